@@ -1,0 +1,80 @@
+# SPDX-License-Identifier: Apache-2.0
+# The three kinds of target this project has, each with the same warnings and language level.
+set(CMAKE_CXX_STANDARD 23)
+set(CMAKE_CXX_STANDARD_REQUIRED ON)
+set(CMAKE_CXX_EXTENSIONS OFF)
+set(CMAKE_EXPORT_COMPILE_COMMANDS ON)
+set(CMAKE_RUNTIME_OUTPUT_DIRECTORY ${CMAKE_BINARY_DIR}/bin)
+
+add_library(zor_options INTERFACE)
+target_compile_options(zor_options INTERFACE
+    -Wall -Wextra -Wpedantic -Wshadow -Wnon-virtual-dtor -Woverloaded-virtual -Wformat=2 -Wundef -Werror
+    -fno-omit-frame-pointer -fstack-protector-strong
+    $<$<CXX_COMPILER_ID:Clang>:-Wthread-safety -Wno-missing-designated-field-initializers>
+    # An aggregate's members carry their own defaults; naming only some of them at a call is how this project writes options.
+    $<$<CXX_COMPILER_ID:GNU>:-Wno-missing-field-initializers>
+    $<$<CONFIG:Release>:-D_FORTIFY_SOURCE=2>)
+target_compile_definitions(zor_options INTERFACE _GNU_SOURCE _FILE_OFFSET_BITS=64
+    ZORVANE_VERSION="${PROJECT_VERSION}")
+target_include_directories(zor_options INTERFACE ${CMAKE_SOURCE_DIR}/src)
+set(CMAKE_POSITION_INDEPENDENT_CODE ON)
+# A name used only by its own files: the folder is the library.
+function(zor_library name)
+    cmake_parse_arguments(ARG "" "" "DIR;EXCLUDE;LINK;INCLUDE" ${ARGN})
+    set(sources "")
+    foreach(dir IN LISTS ARG_DIR)
+        file(GLOB found CONFIGURE_DEPENDS ${CMAKE_SOURCE_DIR}/${dir}/*.cc)
+        list(APPEND sources ${found})
+    endforeach()
+    foreach(file IN LISTS ARG_EXCLUDE)
+        list(FILTER sources EXCLUDE REGEX "/${file}$")
+    endforeach()
+    if(NOT sources)
+        message(STATUS "${name}: no sources yet")
+        add_library(zor_${name} INTERFACE)
+        list(REMOVE_ITEM ARG_LINK PUBLIC)
+        target_link_libraries(zor_${name} INTERFACE zor_options ${ARG_LINK})
+        return()
+    endif()
+    add_library(zor_${name} STATIC ${sources})
+    target_link_libraries(zor_${name} PUBLIC zor_options)
+    target_link_libraries(zor_${name} ${ARG_LINK})
+    foreach(dir IN LISTS ARG_INCLUDE)
+        target_include_directories(zor_${name} PUBLIC ${CMAKE_SOURCE_DIR}/${dir})
+    endforeach()
+endfunction()
+
+function(zor_program name)
+    cmake_parse_arguments(ARG "" "" "DIR;SOURCES;LINK" ${ARGN})
+    set(sources ${ARG_SOURCES})
+    foreach(dir IN LISTS ARG_DIR)
+        file(GLOB found CONFIGURE_DEPENDS ${CMAKE_SOURCE_DIR}/${dir}/*.cc)
+        list(APPEND sources ${found})
+    endforeach()
+    foreach(source IN LISTS ARG_SOURCES)
+        if(NOT EXISTS ${CMAKE_SOURCE_DIR}/${source})
+            return()
+        endif()
+    endforeach()
+    if(NOT sources)
+        return()
+    endif()
+    add_executable(${name} ${sources})
+    target_link_libraries(${name} PRIVATE zor_options ${ARG_LINK})
+    target_link_options(${name} PRIVATE -static-libstdc++ -static-libgcc -Wl,-z,relro,-z,now)
+endfunction()
+
+# zor_test(area LINK libs...): every tests/<area>/*Test.cc in one GoogleTest program named zor_<area>_tests.
+function(zor_test area)
+    cmake_parse_arguments(ARG "" "" "LINK" ${ARGN})
+    file(GLOB sources CONFIGURE_DEPENDS ${CMAKE_CURRENT_SOURCE_DIR}/${area}/*.cc)
+    if(NOT sources)
+        return()
+    endif()
+    add_executable(zor_${area}_tests ${sources})
+    target_include_directories(zor_${area}_tests PRIVATE ${CMAKE_SOURCE_DIR}/tests)
+    target_compile_definitions(zor_${area}_tests PRIVATE ZORVANE_SOURCE_DIR="${CMAKE_SOURCE_DIR}"
+        ZORVANE_BINARY_DIR="${CMAKE_BINARY_DIR}")
+    target_link_libraries(zor_${area}_tests PRIVATE zor_options ${ARG_LINK} GTest::gtest GTest::gtest_main)
+    gtest_discover_tests(zor_${area}_tests DISCOVERY_MODE PRE_TEST PROPERTIES TIMEOUT 300)
+endfunction()
