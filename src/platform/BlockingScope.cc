@@ -1,0 +1,14 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "platform/BlockingScope.h"
+
+namespace zor::platform {
+
+namespace {
+thread_local BlockingObserver* threadObserver = nullptr;
+}
+
+void BlockingObserver::setForThisThread(BlockingObserver* observer) { threadObserver = observer; }
+
+BlockingObserver* BlockingObserver::ofThisThread() { return threadObserver; }
+
+} // namespace zor::platform

@@ -1,0 +1,23 @@
+// SPDX-License-Identifier: Apache-2.0
+// Whether the device is locked.
+#pragma once
+
+#include "platform/RunLoop.h"
+
+#include <functional>
+
+namespace zor::platform {
+
+class DeviceLockState {
+public:
+    virtual ~DeviceLockState() = default;
+    /// 0 unlocked, 1 locked, other numbers for other conditions. Any thread.
+    [[nodiscard]] virtual int currentState() const = 0;
+    /// Calls `changed` on the loop whenever the state may have changed. 0, else a status to log.
+    virtual int registerForChanges(RunLoop& loop, std::function<void()> changed) = 0;
+    /// What the two log lines of a failed registration name.
+    [[nodiscard]] virtual const char* registrationCallName() const = 0;
+    [[nodiscard]] virtual const char* notificationName() const = 0;
+};
+
+} // namespace zor::platform

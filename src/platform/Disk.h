@@ -1,0 +1,63 @@
+// SPDX-License-Identifier: Apache-2.0
+// Every call of the daemon that changes or syncs the disk goes through this interface, one method a system call.
+//
+// That is what makes crash safety testable: the real make passes each call on, a counting make fails it or ends the
+// process at the N-th, a recording make keeps a log from which the states that a power cut may leave are built. Reading
+// calls (openat2, fstat, getdents, read) change nothing and are made directly.
+//
+// Calls act on descriptors or on one name (never a path) inside an open directory; nothing here follows a link in the
+// last component. All return 0 or a descriptor or count when they succeed, else the negative errno. Any thread.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <ctime>
+#include <span>
+#include <string_view>
+#include <sys/types.h>
+
+namespace zor::platform {
+
+class Disk {
+public:
+    virtual ~Disk() = default;
+
+    // Names.
+    virtual int makeDirectory(int directory, const char* name, mode_t mode) = 0;
+    /// A new regular file, opened for reading and writing: O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC.
+    virtual int createFile(int directory, const char* name, mode_t mode) = 0;
+    virtual int makeSymbolicLink(const char* target, int directory, const char* name) = 0;
+    virtual int makeHardLink(int fromDirectory, const char* from, int toDirectory, const char* to) = 0;
+    virtual int makeFifo(int directory, const char* name, mode_t mode) = 0;
+    /// `flags` as renameat2's: 0 or RENAME_NOREPLACE or RENAME_EXCHANGE.
+    virtual int rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) = 0;
+    virtual int unlinkFile(int directory, const char* name) = 0;
+    virtual int removeDirectory(int directory, const char* name) = 0;
+
+    // Inodes. `fd` may be an O_PATH descriptor for changeMode and changeOwner.
+    virtual int changeMode(int fd, mode_t mode) = 0;
+    virtual int changeOwner(int fd, uid_t uid, gid_t gid) = 0;
+    virtual int setTimes(int fd, const timespec& access, const timespec& modification) = 0;
+    virtual int setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) = 0;
+    /// The inode flags of FS_IOC_SETFLAGS (FS_IMMUTABLE_FL and its kin).
+    virtual int setInodeFlags(int fd, int flags) = 0;
+
+    // Data.
+    /// Writes all of `bytes` at the descriptor's offset, or fails.
+    virtual int write(int fd, std::span<const std::uint8_t> bytes) = 0;
+    /// Makes `to`, empty and new, share all data of `from` (FICLONE); -EOPNOTSUPP, -EXDEV, -EINVAL where that cannot be.
+    virtual int cloneData(int from, int to) = 0;
+    /// Copies up to `bytesMax` at both offsets (copy_file_range); the count copied, 0 at the end.
+    virtual ssize_t copyData(int from, int to, std::size_t bytesMax) = 0;
+
+    // Syncs.
+    /// The file's data and everything needed to reach it through its inode; for a directory, its entries.
+    virtual int sync(int fd) = 0;
+    /// Everything of the file system that `fd` lies on.
+    virtual int syncFileSystem(int fd) = 0;
+    /// Writes the file's data out and waits, so that on a file system with an ordered journal no later change can become
+    /// durable before it. Commits nothing by itself.
+    virtual int orderData(int fd) = 0;
+};
+
+} // namespace zor::platform

@@ -1,0 +1,56 @@
+// SPDX-License-Identifier: Apache-2.0
+// Who is at the other end of a connection, as the kernel and the identity registry vouch for it.
+#pragma once
+
+#include "plist/Value.h"
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <sys/types.h>
+
+namespace zor::platform {
+
+/// What the registry grants to one executable. Immutable and shared: a peer's dictionary is handed out by pointer, never
+/// copied, and two messages of an unchanged peer get the very same object.
+struct IdentityGrant {
+    std::optional<std::string> identifier;
+    std::optional<plist::Dictionary> entitlements;
+    bool kernelAgent = false;
+};
+
+/// The answer for one message.
+struct Identity {
+    pid_t pid = 0;
+    /// As reported: on a root that is not owned by root its owner is 0.
+    std::uint32_t effectiveUserId = 0;
+    /// nullptr when the executable matches no entry.
+    std::shared_ptr<const IdentityGrant> grant;
+    /// In words, for people: why there is no grant, or which entry gave it.
+    std::string explanation;
+};
+
+/// One connected peer, made when its connection is accepted. One thread at a time.
+class Peer {
+public:
+    virtual ~Peer() = default;
+    /// Who the peer is now. Checked against the kernel on every call: a peer that has executed another program, or has exited,
+    /// stops being what it was. Cheap when nothing changed: no allocation, and `explanation` is left empty unless asked for.
+    enum class Explain { no, yes };
+    [[nodiscard]] virtual Identity identify(Explain explain) = 0;
+    [[nodiscard]] virtual pid_t pid() const = 0;
+    /// The uid that the kernel reports, for limits by uid.
+    [[nodiscard]] virtual uid_t kernelUserId() const = 0;
+};
+
+class PeerIdentity {
+public:
+    virtual ~PeerIdentity() = default;
+    /// Pins the peer of a connected socket. nullptr when the kernel does not tell who it is. Any thread.
+    [[nodiscard]] virtual std::unique_ptr<Peer> peerOfSocket(int socket) = 0;
+    /// Whether this kernel uid counts as the owner of the root: root, or the daemon's own user.
+    [[nodiscard]] virtual bool ownsRoot(uid_t uid) const = 0;
+};
+
+} // namespace zor::platform
