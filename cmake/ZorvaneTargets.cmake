@@ -14,11 +14,20 @@ target_compile_options(zor_options INTERFACE
     # An aggregate's members carry their own defaults; naming only some of them at a call is how this project writes options.
     $<$<CXX_COMPILER_ID:GNU>:-Wno-missing-field-initializers>
     $<$<CONFIG:Release>:-D_FORTIFY_SOURCE=2>)
-target_compile_definitions(zor_options INTERFACE _GNU_SOURCE _FILE_OFFSET_BITS=64
+# The standard library's own checks (an index out of range, an empty optional) stay on in every build.
+target_compile_definitions(zor_options INTERFACE _GNU_SOURCE _FILE_OFFSET_BITS=64 _GLIBCXX_ASSERTIONS
     ZORVANE_VERSION="${PROJECT_VERSION}")
 target_include_directories(zor_options INTERFACE ${CMAKE_SOURCE_DIR}/src)
 set(CMAKE_POSITION_INDEPENDENT_CODE ON)
-# A name used only by its own files: the folder is the library.
+
+# A changed list of checks judges every source anew.
+function(zor_depend_on_tidy sources)
+    if(ZORVANE_TIDY)
+        set_property(SOURCE ${sources} APPEND PROPERTY OBJECT_DEPENDS ${CMAKE_SOURCE_DIR}/.clang-tidy)
+    endif()
+endfunction()
+
+# zor_library(name DIR folders... [EXCLUDE files...] LINK ... [INCLUDE folders...]): the sources of these folders, as zor_<name>.
 function(zor_library name)
     cmake_parse_arguments(ARG "" "" "DIR;EXCLUDE;LINK;INCLUDE" ${ARGN})
     set(sources "")
@@ -37,6 +46,7 @@ function(zor_library name)
         return()
     endif()
     add_library(zor_${name} STATIC ${sources})
+    zor_depend_on_tidy("${sources}")
     target_link_libraries(zor_${name} PUBLIC zor_options)
     target_link_libraries(zor_${name} ${ARG_LINK})
     foreach(dir IN LISTS ARG_INCLUDE)
@@ -44,6 +54,16 @@ function(zor_library name)
     endforeach()
 endfunction()
 
+# zor_cross(lower upper): sources of the lower library call the upper one too. Only static libraries may link in a circle.
+function(zor_cross lower upper)
+    get_target_property(lowerType zor_${lower} TYPE)
+    get_target_property(upperType zor_${upper} TYPE)
+    if(lowerType STREQUAL "STATIC_LIBRARY" AND upperType STREQUAL "STATIC_LIBRARY")
+        target_link_libraries(zor_${lower} PUBLIC zor_${upper})
+    endif()
+endfunction()
+
+# zor_program(name SOURCES files... | DIR folders... LINK ...)
 function(zor_program name)
     cmake_parse_arguments(ARG "" "" "DIR;SOURCES;LINK" ${ARGN})
     set(sources ${ARG_SOURCES})
@@ -60,8 +80,10 @@ function(zor_program name)
         return()
     endif()
     add_executable(${name} ${sources})
+    zor_depend_on_tidy("${sources}")
     target_link_libraries(${name} PRIVATE zor_options ${ARG_LINK})
-    target_link_options(${name} PRIVATE -static-libstdc++ -static-libgcc -Wl,-z,relro,-z,now)
+    # What is installed carries its C++ runtime; a sanitizer has to see the shared one.
+    target_link_options(${name} PRIVATE -Wl,-z,relro,-z,now $<$<CONFIG:Release>:-static-libstdc++;-static-libgcc>)
 endfunction()
 
 # zor_test(area LINK libs...): every tests/<area>/*Test.cc in one GoogleTest program named zor_<area>_tests.
@@ -77,4 +99,12 @@ function(zor_test area)
         ZORVANE_BINARY_DIR="${CMAKE_BINARY_DIR}")
     target_link_libraries(zor_${area}_tests PRIVATE zor_options ${ARG_LINK} GTest::gtest GTest::gtest_main)
     gtest_discover_tests(zor_${area}_tests DISCOVERY_MODE PRE_TEST PROPERTIES TIMEOUT 300)
+endfunction()
+
+# zor_fuzz(name LINK libs...): fuzz/<name>.cc as a libFuzzer program. Its seeds are the files in fuzz/seeds/<name>/.
+function(zor_fuzz name)
+    cmake_parse_arguments(ARG "" "" "LINK" ${ARGN})
+    add_executable(${name} ${CMAKE_SOURCE_DIR}/fuzz/${name}.cc)
+    target_link_libraries(${name} PRIVATE zor_options ${ARG_LINK})
+    target_link_options(${name} PRIVATE -fsanitize=fuzzer)
 endfunction()
