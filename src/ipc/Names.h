@@ -1,0 +1,16 @@
+// SPDX-License-Identifier: Apache-2.0
+// Where clients find the daemon. Paths are relative to the system root, which is / on a device.
+#pragma once
+
+#include <string_view>
+
+namespace zor::ipc {
+
+/// The service's name; also the name of its socket.
+inline constexpr std::string_view serviceName = "com.veltra.zorvaned";
+inline constexpr std::string_view upcallServiceName = "com.veltra.zorvaned.upcall";
+inline constexpr std::string_view statusSocketName = "zorvaned.status";
+/// Holds the sockets.
+inline constexpr std::string_view runtimeDirectory = "run/zorvane";
+
+} // namespace zor::ipc
