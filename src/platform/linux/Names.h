@@ -1,0 +1,46 @@
+// SPDX-License-Identifier: Apache-2.0
+// Every name that the platform layer has below the system root, spelled here and nowhere else.
+//
+// Paths are relative to the root's descriptor and open with openBeneath; SystemRoot::path turns them into absolute
+// ones.
+#pragma once
+
+namespace zor::platform::names {
+
+// What the daemon reads.
+inline constexpr const char* identityDirectory = "etc/zorvane/identities.d";
+inline constexpr const char* identityFileSuffix = ".plist";
+inline constexpr const char* wellKnownTable = "etc/zorvane/wellknown.plist";
+inline constexpr const char* internalBuildMark = "etc/zorvane/internal-build";
+inline constexpr const char* operatingSystemRelease = "etc/os-release";
+inline constexpr const char* passwordFile = "etc/passwd";
+
+// What lives as long as the boot. Single names lie in runtimeDirectory.
+inline constexpr const char* runParent = "run";
+inline constexpr const char* runtimeName = "zorvane";
+inline constexpr const char* runtimeDirectory = "run/zorvane";
+inline constexpr const char* serviceSocket = "com.veltra.zorvaned";
+inline constexpr const char* upcallSocket = "com.veltra.zorvaned.upcall";
+inline constexpr const char* statusSocket = "zorvaned.status";
+inline constexpr const char* lockFile = "zorvaned.lock";
+inline constexpr const char* lockState = "lockstate";
+inline constexpr const char* sandboxDirectory = "sandbox";
+inline constexpr const char* assertionDirectory = "assertions";
+
+// The log directory itself is the store's to name and make; these are its files.
+inline constexpr const char* logFile = "zorvaned.log";
+inline constexpr const char* crashFile = "zorvaned.crash";
+
+// POSIX semaphore, followed by "." and a hash of the root unless that is "/".
+inline constexpr const char* bootMarker = "zorvaned.fb_check";
+
+// Extended attribute with a data-protection class: the first where the daemon is root.
+inline constexpr const char* protectionAttribute = "trusted.zorvane.protection";
+inline constexpr const char* protectionAttributeUser = "user.zorvane.protection";
+
+// Names of the sockets that the service manager passes.
+inline constexpr const char* passedServiceSocket = "ipsi";
+inline constexpr const char* passedUpcallSocket = "upcall";
+inline constexpr const char* passedStatusSocket = "status";
+
+} // namespace zor::platform::names

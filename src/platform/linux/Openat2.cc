@@ -1,0 +1,43 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "platform/linux/Openat2.h"
+
+#include <cerrno>
+#include <cstdint>
+#include <fcntl.h>
+#include <linux/openat2.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+namespace zor::platform {
+
+namespace {
+
+/// The kernel answers EAGAIN when a rename raced with its check; a client that renames without pause must not hold us.
+constexpr int attemptsMax = 128;
+
+std::expected<FileDescriptor, int> resolve(int directory, const char* path, int flags, mode_t mode,
+                                           std::uint64_t rules) {
+    open_how how{};
+    how.flags = static_cast<std::uint64_t>(static_cast<unsigned>(flags | O_CLOEXEC));
+    how.mode = mode;
+    how.resolve = rules;
+    for (int attempt = 0;; ++attempt) {
+        const long fd = ::syscall(SYS_openat2, directory, path, &how, sizeof how);
+        if (fd >= 0)
+            return FileDescriptor(static_cast<int>(fd));
+        if (errno != EINTR && (errno != EAGAIN || attempt >= attemptsMax))
+            return std::unexpected(errno);
+    }
+}
+
+} // namespace
+
+std::expected<FileDescriptor, int> openBeneath(int directory, const char* relativePath, int flags, mode_t mode) {
+    return resolve(directory, relativePath, flags, mode, RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS);
+}
+
+std::expected<FileDescriptor, int> openInRoot(int directory, const char* relativePath, int flags) {
+    return resolve(directory, relativePath, flags, 0, RESOLVE_IN_ROOT | RESOLVE_NO_MAGICLINKS);
+}
+
+} // namespace zor::platform

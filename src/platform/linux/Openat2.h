@@ -1,0 +1,21 @@
+// SPDX-License-Identifier: Apache-2.0
+// Opening below a directory that others may write to: no link is followed and no step leads out, whatever the tree does
+// meanwhile. Any thread.
+#pragma once
+
+#include "platform/FileDescriptor.h"
+
+#include <expected>
+#include <sys/types.h>
+
+namespace zor::platform {
+
+/// Opens `relativePath` below `directory` (RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS; O_CLOEXEC is
+/// added). A link anywhere gives ELOOP (with O_PATH | O_NOFOLLOW a link in the last place too), a step out EXDEV.
+[[nodiscard]] std::expected<FileDescriptor, int> openBeneath(int directory, const char* relativePath, int flags,
+                                                             mode_t mode = 0);
+
+/// The same for trees that only root writes to, such as DIR/etc: links are followed, as if `directory` were "/".
+[[nodiscard]] std::expected<FileDescriptor, int> openInRoot(int directory, const char* relativePath, int flags);
+
+} // namespace zor::platform
