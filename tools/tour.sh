@@ -1,0 +1,136 @@
+#!/bin/bash
+# SPDX-License-Identifier: Apache-2.0
+# A short tour for a person: starts the daemon on a throw-away root below build/, uses it through zorvanectl, kills it, starts
+# it again, and says at each step what happened. Every step is checked; the first surprise ends the tour with the log.
+# usage: tools/tour.sh FOLDER-OF-THE-BINARIES
+set -euo pipefail
+umask 022
+binaries="$(readlink -f "${1:?folder of the binaries}")"
+cd "$(dirname "$(readlink -f "${BASH_SOURCE[0]}")")/.."
+root="$PWD/build/tour-root"
+log="$root/private/var/root/Library/Logs/Zorvane/zorvaned.log"
+console="$PWD/build/tour-console.log"
+daemon=
+
+say() { printf '\n\033[1m%s\033[0m\n' "$*"; }
+
+fail() {
+    echo "tour: $*" >&2
+    echo "tour: the daemon's last words ($console):" >&2
+    tail -n 20 "$console" >&2 || true
+    exit 1
+}
+
+ending() {
+    if [[ -n "$daemon" ]]; then
+        kill -KILL "$daemon" 2>/dev/null || true
+        wait "$daemon" 2>/dev/null || true
+    fi
+}
+trap ending EXIT
+
+# Shows the command as a person would type it, then its answer, kept in $answer.
+ctl() {
+    printf '$ zorvanectl %s\n' "$*"
+    answer="$("$binaries/zorvanectl" --root "$root" "$@")" || fail "zorvanectl $* failed: $answer"
+    printf '%s\n' "${answer//$root\//}"
+}
+
+# The first path below the root in the last answer.
+pathInAnswer() {
+    [[ "$answer" =~ $root/[^\"[:space:]]+ ]] || fail "no path in: $answer"
+    printf '%s' "${BASH_REMATCH[0]}"
+}
+
+startDaemon() {
+    "$binaries/zorvaned" --root "$root" --foreground "$@" 2>>"$console" &
+    daemon=$!
+    local try
+    for ((try = 0; try < 100; ++try)); do
+        "$binaries/zorvanectl" --root "$root" status >/dev/null 2>&1 && return 0
+        kill -0 "$daemon" 2>/dev/null || fail "the daemon ended at once"
+        sleep 0.05
+    done
+    fail "the daemon does not answer"
+}
+
+# What lies below a folder of the root, indented by depth, directories with a slash.
+tree() {
+    (cd "$root" && find "$1" -mindepth 1 \( -type d -printf '%P/\n' \) -o -printf '%P\n') | LC_ALL=C sort |
+        sed -E 's|[^/]+/([^/])|    \1|g'
+}
+
+rm -rf "$root"
+mkdir -p "$root"/{etc/zorvane/identities.d,private/var/mobile,private/var/second,private/var/brevad,tmp}
+: >"$console"
+cat >"$root/etc/passwd" <<'TEXT'
+root:x:0:0:root:/private/var/root:/bin/sh
+mobile:x:501:501:Mobile User:/private/var/mobile:/bin/sh
+second:x:502:502:Second User:/private/var/second:/bin/sh
+TEXT
+cat >"$root/etc/zorvane/identities.d/zorvanectl.plist" <<TEXT
+<?xml version="1.0" encoding="UTF-8"?>
+<plist version="1.0">
+<dict>
+    <key>Identifier</key>
+    <string>com.veltra.zorvanectl</string>
+    <key>Executable</key>
+    <string>$binaries/zorvanectl</string>
+    <key>Entitlements</key>
+    <dict>
+        <key>com.veltra.private.Zorvane.allowed</key>
+        <true/>
+    </dict>
+</dict>
+</plist>
+TEXT
+
+say "A root of its own: ${root#"$PWD/"} holds two users and says who zorvanectl is. The daemon starts on it."
+startDaemon --forget-boot
+ctl status
+
+say "An application of user 501 and one of user 502 get their containers."
+ctl create org.example.notes --class data-app --user 501
+notes="$(pathInAnswer)"
+ctl create org.example.maps --class data-app --user 502
+
+say "The first one writes a file. Nobody asks the daemon for that: the directory is its own."
+echo "milk, bread" >"$notes/Documents/shopping.txt"
+ls -l "$notes/Documents" | tail -n +2
+ctl list --class data-app --user 501
+
+say "The daemon is killed in the middle of its life: no signal it could handle, no time to write anything."
+kill -KILL "$daemon"
+wait "$daemon" 2>/dev/null || true
+echo "\$ kill -KILL $daemon"
+startDaemon
+
+say "A new one finds both again, with what was in them."
+ctl lookup org.example.notes --class data-app --user 501
+[[ "$(pathInAnswer)" == "$notes" ]] || fail "the container moved"
+[[ "$(cat "$notes/Documents/shopping.txt")" == "milk, bread" ]] || fail "the file changed"
+ctl lookup org.example.maps --class data-app --user 502
+
+say "A transient container is never used twice: asking again gives a fresh one, and the first goes to death row."
+ctl create org.example.scratch --class data-app --user 501 --transient
+scratch="$(pathInAnswer)"
+echo draft >"$scratch/tmp/draft"
+ctl create org.example.scratch --class data-app --user 501 --transient
+[[ "$(pathInAnswer)" != "$scratch" && ! -e "$scratch" ]] || fail "the transient container was used again"
+
+say "Death row is emptied in the background. This waits until it is."
+ctl empty-death-row
+[[ -z "$(ls -A "$root/private/var/root/Library/Caches/com.veltra.zorvaned/Dead")" ]] || fail "death row is not empty"
+
+say "What lies on disk now (private/var):"
+tree private/var
+
+say "What the log says:"
+grep -v '<7>' "$log" | tail -n 12 | sed "s|$root/||g"
+
+say "How it is, and the end: SIGTERM lets it finish what it does."
+ctl status
+kill -TERM "$daemon"
+wait "$daemon" || fail "the daemon ended with status $?"
+daemon=
+echo "The daemon has ended. Its root stays at ${root#"$PWD/"}; the next tour starts anew."
