@@ -1,0 +1,86 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "fs/AtomicFile.h"
+
+#include "fs/BulkDirectoryRead.h"
+#include "platform/FileDescriptor.h"
+#include "platform/linux/Openat2.h"
+
+#include <cerrno>
+#include <fcntl.h>
+#include <sys/random.h>
+
+namespace zor::fs {
+
+using platform::FileDescriptor;
+
+namespace {
+
+constexpr std::size_t randomCharacters = 6;
+constexpr int namesTriedMax = 16;
+
+std::string temporaryPrefix(const std::string& name) { return "." + name + ".new-"; }
+
+/// What stops before their rename left of earlier writes of the same target.
+void removeLeftovers(platform::Disk& disk, int directory, const std::string& prefix) {
+    const auto listing = platform::openBeneath(directory, ".", O_RDONLY | O_DIRECTORY);
+    if (!listing)
+        return;
+    std::vector<std::string> leftovers;
+    BulkDirectoryRead entries(listing->get());
+    while (const auto* entry = entries.next())
+        if (std::string_view(entry->name).starts_with(prefix))
+            leftovers.emplace_back(entry->name);
+    for (const std::string& leftover : leftovers)
+        disk.unlinkFile(directory, leftover.c_str());
+}
+
+} // namespace
+
+std::string uniqueName(std::string prefix) {
+    static constexpr char alphabet[] = "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789_-";
+    static_assert(sizeof alphabet - 1 == 64);
+    std::uint8_t random[randomCharacters] = {};
+    // Uniqueness comes from O_EXCL and mkdir; without entropy the callers' retries end with EEXIST.
+    if (::getrandom(random, sizeof random, GRND_NONBLOCK) < 0)
+        random[0] = 0;
+    for (const std::uint8_t byte : random)
+        prefix += alphabet[byte & 63];
+    return prefix;
+}
+
+int writeNewFile(platform::Disk& disk, int directory, const char* name, mode_t mode,
+                 std::span<const std::uint8_t> bytes) {
+    FileDescriptor file(disk.createFile(directory, name, mode));
+    if (!file.valid())
+        return file.get();
+    int status = disk.changeMode(file.get(), mode);
+    if (status == 0)
+        status = disk.write(file.get(), bytes);
+    return status < 0 ? status : file.release();
+}
+
+int replaceFileDurably(platform::Disk& disk, int directory, const std::string& name, mode_t mode,
+                       std::span<const std::uint8_t> bytes) {
+    const std::string prefix = temporaryPrefix(name);
+    removeLeftovers(disk, directory, prefix);
+    std::string temporary;
+    int descriptor = -EEXIST;
+    for (int tried = 0; descriptor == -EEXIST && tried < namesTriedMax; ++tried) {
+        temporary = uniqueName(prefix);
+        descriptor = writeNewFile(disk, directory, temporary.c_str(), mode, bytes);
+    }
+    const FileDescriptor file(descriptor < 0 ? -1 : descriptor);
+    int status = descriptor < 0 ? descriptor : disk.sync(file.get());
+    if (status == 0)
+        status = disk.rename(directory, temporary.c_str(), directory, name.c_str(), 0);
+    if (status < 0) {
+        if (descriptor != -EEXIST)
+            disk.unlinkFile(directory, temporary.c_str());
+        return status;
+    }
+    // The directory descriptor may be O_PATH, which cannot be synced.
+    const auto listing = platform::openBeneath(directory, ".", O_RDONLY | O_DIRECTORY);
+    return listing ? disk.sync(listing->get()) : -listing.error();
+}
+
+} // namespace zor::fs

@@ -1,0 +1,61 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "fs/OwnedFile.h"
+
+#include "platform/linux/Openat2.h"
+
+#include <cerrno>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+namespace zor::fs {
+
+namespace {
+
+/// EPERM for a file that somebody else may have written.
+int judge(const struct stat& status, std::size_t bytesMax) {
+    const bool trustedOwner = status.st_uid == 0 || status.st_uid == ::geteuid();
+    if (!S_ISREG(status.st_mode) || status.st_nlink != 1 || !trustedOwner || (status.st_mode & (S_IWGRP | S_IWOTH)))
+        return EPERM;
+    return static_cast<std::size_t>(status.st_size) > bytesMax ? EFBIG : 0;
+}
+
+} // namespace
+
+std::expected<plist::Data, int> readOwnedFile(int directory, const char* path, std::size_t bytesMax) {
+    const auto file = platform::openBeneath(directory, path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
+    if (!file)
+        return std::unexpected(file.error());
+    struct stat status {};
+    if (::fstat(file->get(), &status) != 0)
+        return std::unexpected(errno);
+    if (const int refused = judge(status, bytesMax))
+        return std::unexpected(refused);
+    // One byte more than it had tells a file that grows while it is read from one that was read whole.
+    plist::Data bytes(static_cast<std::size_t>(status.st_size) + 1);
+    std::size_t length = 0;
+    while (length < bytes.size()) {
+        const ssize_t count = ::read(file->get(), bytes.data() + length, bytes.size() - length);
+        if (count < 0 && errno == EINTR)
+            continue;
+        if (count < 0)
+            return std::unexpected(errno);
+        length += static_cast<std::size_t>(count);
+        if (count == 0 || length == static_cast<std::size_t>(status.st_size))
+            break;
+    }
+    bytes.resize(length);
+    return bytes;
+}
+
+int isRegularFile(int directory, const char* path) {
+    const auto item = platform::openBeneath(directory, path, O_PATH | O_NOFOLLOW);
+    if (!item)
+        return item.error();
+    struct stat status {};
+    if (::fstat(item->get(), &status) != 0)
+        return errno;
+    return S_ISREG(status.st_mode) ? 0 : EINVAL;
+}
+
+} // namespace zor::fs

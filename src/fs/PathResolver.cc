@@ -1,0 +1,81 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "fs/PathResolver.h"
+
+#include "platform/linux/Openat2.h"
+
+#include <cerrno>
+#include <fcntl.h>
+
+namespace zor::fs {
+
+using platform::openBeneath;
+
+const char* PathResolver::relative(const FileURL& url) const {
+    const std::string& root = root_.canonicalPath();
+    const std::string& path = url.path();
+    if (path.empty() || path[0] != '/')
+        return nullptr;
+    if (root == "/")
+        return path.size() == 1 ? "." : path.c_str() + 1;
+    if (path.compare(0, root.size(), root) != 0)
+        return nullptr;
+    if (path.size() == root.size())
+        return ".";
+    return path[root.size()] == '/' ? path.c_str() + root.size() + 1 : nullptr;
+}
+
+OpenResult PathResolver::openItem(const FileURL& url, int flags) const {
+    const char* path = relative(url);
+    if (!path)
+        return std::unexpected(EXDEV);
+    return openBeneath(root_.descriptor(), path, flags | O_NOFOLLOW);
+}
+
+OpenResult PathResolver::openDirectory(const FileURL& url) const { return openItem(url, O_RDONLY | O_DIRECTORY); }
+
+OpenResult PathResolver::openDirectoryPath(const FileURL& url) const { return openItem(url, O_PATH | O_DIRECTORY); }
+
+std::expected<ParentAndName, int> PathResolver::openParent(const FileURL& url) const {
+    OpenResult directory = openDirectoryPath(url.deletingLastPathComponent());
+    if (!directory)
+        return std::unexpected(directory.error());
+    return ParentAndName{std::move(*directory), std::string(url.lastPathComponent())};
+}
+
+int PathResolver::status(const FileURL& url, struct stat& status) const {
+    const auto parent = openParent(url);
+    if (!parent)
+        return parent.error();
+    return ::fstatat(parent->directory.get(), parent->name.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0 ? 0 : errno;
+}
+
+OpenResult PathResolver::makeDirectories(platform::Disk& disk, const FileURL& url) const {
+    OpenResult whole = openDirectoryPath(url);
+    if (whole || whole.error() != ENOENT)
+        return whole;
+    const char* path = relative(url);
+    if (!path)
+        return std::unexpected(EXDEV);
+    OpenResult current = openBeneath(root_.descriptor(), ".", O_PATH | O_DIRECTORY);
+    for (const char* next = path; current && *next != '\0';) {
+        const std::string component(next, std::string_view(next).find('/') == std::string_view::npos
+                                              ? std::string_view(next).size()
+                                              : std::string_view(next).find('/'));
+        next += component.size();
+        while (*next == '/')
+            ++next;
+        if (component.empty())
+            continue;
+        OpenResult below = openBeneath(current->get(), component.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
+        if (!below && below.error() == ENOENT) {
+            const int made = disk.makeDirectory(current->get(), component.c_str(), 0755);
+            if (made < 0 && made != -EEXIST)
+                return std::unexpected(-made);
+            below = openBeneath(current->get(), component.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
+        }
+        current = std::move(below);
+    }
+    return current;
+}
+
+} // namespace zor::fs

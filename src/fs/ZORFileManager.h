@@ -1,0 +1,117 @@
+// SPDX-License-Identifier: Apache-2.0
+// The one place where the daemon creates, moves, copies, removes, lists, re-owns and measures directories.
+//
+// It has no state and no lock; any thread may call any operation. Paths are resolved anew by each call without following a
+// link (PathResolver), everything after that acts on descriptors: what a path names may change at any moment, what a
+// descriptor names may not. Failures are POSIX-domain errors that carry the words below and are not logged here; whoever
+// returns them to a client logs.
+//
+// What a stop in the middle leaves: of a new directory, a sibling named "NAME.XXXXXX"; of a move across file systems, a
+// hidden ".zorvaned-copy-XXXXXX" beside the destination, and the source. Neither is ever taken for the real thing.
+#pragma once
+
+#include "daemon/base/FileURL.h"
+#include "daemon/base/Result.h"
+#include "fs/PathResolver.h"
+#include "fs/TreeWalker.h"
+#include "platform/Disk.h"
+#include "platform/FileProtectionClass.h"
+#include "plist/Value.h"
+
+#include <atomic>
+#include <functional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace zor {
+
+enum class Intermediates { no, yes };
+
+/// A protection-class argument that leaves the class alone.
+inline constexpr int protectionClassUnchanged = -1;
+/// An owner argument that leaves the ownership as it comes.
+inline constexpr std::uint32_t ownerUnchanged = 0;
+
+struct DirectoryAttributes {
+    mode_t mode = 0755;
+    std::uint32_t owner = ownerUnchanged; // user id and group id alike
+    int protectionClass = protectionClassUnchanged;
+};
+
+class ZORFileManager {
+public:
+    ZORFileManager(const Log& log, const platform::SystemRoot& root, platform::Disk& disk,
+                   platform::FileProtectionClass& protection)
+        : log_(log), disk_(disk), protection_(protection), resolver_(root) {}
+    ZORFileManager(const ZORFileManager&) = delete;
+    ZORFileManager& operator=(const ZORFileManager&) = delete;
+
+    // Creation. An existing directory gets its attributes again and counts as created; a new one comes into existence under
+    // its final name only with them.
+    Result<void> createDirectoryAtURL(const FileURL& url, Intermediates intermediates,
+                                      const DirectoryAttributes& attributes);
+    /// A new directory "temp." and six characters, mode 0700.
+    Result<FileURL> createTemporaryDirectoryInDirectoryURL(const FileURL& directory,
+                                                           std::uint32_t owner = ownerUnchanged);
+
+    // Removal, copy, move.
+    /// Removes a tree; what is missing is not missed. An item that cannot be removed lets the rest go and is the error.
+    /// An immutable file is made mutable and removed. Absent URL: EFAULT.
+    Result<void> removeItemAtURL(const std::optional<FileURL>& url);
+    Result<void> copyItemAtURL(const FileURL& source, const FileURL& destination);
+    Result<void> copyItemIfExistsAtURL(const FileURL& source, const FileURL& destination);
+    Result<void> moveItemAtURL(const FileURL& source, const FileURL& destination);
+    Result<void> moveItemIfExistsAtURL(const FileURL& source, const FileURL& destination);
+
+    // Walking and listing.
+    /// Every entry of the tree to the visitor, directories before and after what they hold.
+    Result<void> _traverseDirectory(const FileURL& url, const std::function<Result<void>(const fs::WalkEntry&)>& visitor);
+    /// Owner of everything but metadata files; 0755 for directories and what has an execute bit, else 0644.
+    Result<void> standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid);
+    /// The entries whose names do not begin with ".", in the directory's order.
+    Result<std::vector<FileURL>> urlsForItemsInDirectoryAtURL(const FileURL& directory);
+    /// To the log, one line an entry.
+    void printDirectoryStructureAtURL(const FileURL& url);
+    /// Allocated bytes of everything below that is no directory, hard links once.
+    [[nodiscard]] std::uint64_t diskUsageForURL(const FileURL& url);
+
+    // Existence. An item that cannot be examined neither exists nor does not exist.
+    [[nodiscard]] bool itemExistsAtURL(const FileURL& url);
+    [[nodiscard]] bool itemDoesNotExistAtURL(const FileURL& url);
+
+    // Data protection.
+    Result<int> dataProtectionClassOfItemAtURL(const FileURL& url);
+    /// `predicate` gets the current class and says whether to set; without one, always.
+    Result<void> setDataProtectionClassOfItemAtURL(const FileURL& url, int protectionClass,
+                                                   const std::function<bool(int)>& predicate = nullptr);
+
+    [[nodiscard]] const fs::PathResolver& resolver() const { return resolver_; }
+    [[nodiscard]] platform::Disk& disk() { return disk_; }
+    /// Sets a class at the creation of a directory; a file system without classes is said once and is no failure.
+    /// 0 or an errno.
+    int setClassAtCreation(int directory, int protectionClass);
+
+private:
+    enum class MissingSource { fails, isFine };
+    Result<void> _copyItemAtURL(const FileURL& source, const FileURL& destination, MissingSource missing);
+    Result<void> _moveItemAtURL(const FileURL& source, const FileURL& destination, MissingSource missing);
+    Result<void> moveAcrossFileSystems(const FileURL& source, const FileURL& destination);
+    Result<bool> sourceIsMissing(const FileURL& source);
+    /// Copies beside the destination and renames, so that a partial copy never has the final name.
+    Result<void> copyTree(const FileURL& source, const FileURL& destination);
+
+    Result<void> makeNewDirectory(const FileURL& url, Intermediates intermediates,
+                                  const DirectoryAttributes& attributes);
+    Result<void> applyAttributes(int parent, const std::string& name, const std::string& path,
+                                 const DirectoryAttributes& attributes);
+    void standardizeEntry(int parent, const char* name, const std::string& path, uid_t uid, gid_t gid);
+
+    const Log& log_;
+    platform::Disk& disk_;
+    platform::FileProtectionClass& protection_;
+    fs::PathResolver resolver_;
+    std::atomic<bool> saidClassesUnsupported_{false};
+};
+
+} // namespace zor
