@@ -57,7 +57,7 @@ startDaemon() {
 # What lies below a folder of the root, indented by depth, directories with a slash.
 tree() {
     (cd "$root" && find "$1" -mindepth 1 \( -type d -printf '%P/\n' \) -o -printf '%P\n') | LC_ALL=C sort |
-        sed -E 's|[^/]+/([^/])|    \1|g'
+        sed -E ':next; s|^( *)[^/ ][^/]*/([^/])|\1    \2|; t next'
 }
 
 rm -rf "$root"
