@@ -1,0 +1,53 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "daemon/base/UserIdentity.h"
+
+namespace zor {
+
+namespace {
+/// Clients up to this uid belong to the system and may act for other users; the ones above only as themselves.
+constexpr std::uint32_t lastSystemClientUserId = 500;
+} // namespace
+
+bool userIdIsValidForClass(ContainerClass containerClass, std::uint32_t userId) {
+    if (isBundleClass(containerClass))
+        return userId == bundleOwnerUserId;
+    if (isSystemClass(containerClass))
+        return userId == systemOwnerUserId;
+    if (isPerUserClass(containerClass))
+        return userId >= firstMobileUserId && userId <= lastMobileUserId;
+    return false;
+}
+
+Result<std::uint32_t> UserIdentity::validateUserId(std::uint32_t requested, ContainerClass containerClass,
+                                                   std::uint32_t clientUserId) {
+    if (isBundleClass(containerClass) || isSystemClass(containerClass)) {
+        if (userIdIsValidForClass(containerClass, requested))
+            return requested;
+    } else if (clientUserId <= lastSystemClientUserId) {
+        if (requested == currentUserPlaceholder)
+            return getCurrentMobileUserId();
+        if (userIdIsValidForClass(containerClass, requested))
+            return requested;
+    } else if (requested == currentUserPlaceholder || requested == clientUserId) {
+        return clientUserId;
+    }
+    const std::string text = formatted("Invalid userId %u for class %llu from client %u", requested,
+                                       static_cast<unsigned long long>(containerClass), clientUserId);
+    log_.writeText(logLevelError, __func__, text);
+    return ZORError(ZOR_HERE, ErrorDomain::zor, static_cast<int>(ErrorCode::valueNotAllowed), text);
+}
+
+std::uint32_t UserIdentity::getCurrentMobileUserId() {
+    std::call_once(lookup_, [this] {
+        constexpr const char* function = "__getCurrentMobileUserId_block_invoke";
+        if (const auto entry = passwords_.entryForName("mobile")) {
+            mobileUserId_ = entry->uid;
+            log_.write(logLevelError, function, "Current mobile user ID is %u", mobileUserId_);
+        } else {
+            log_.write(logLevelError, function, "Failed to get mobile uid. This is bad");
+        }
+    });
+    return mobileUserId_;
+}
+
+} // namespace zor

@@ -1,0 +1,41 @@
+// SPDX-License-Identifier: Apache-2.0
+// Whose containers a request may act on: the owner that each class demands, and what a client's own uid allows.
+#pragma once
+
+#include "daemon/base/ContainerClass.h"
+#include "daemon/base/Result.h"
+#include "platform/Queries.h"
+
+#include <cstdint>
+#include <mutex>
+
+namespace zor {
+
+/// The user id in a request that stands for the current mobile user. Never stored as an owner.
+inline constexpr std::uint32_t currentUserPlaceholder = 1;
+inline constexpr std::uint32_t bundleOwnerUserId = 33;
+inline constexpr std::uint32_t systemOwnerUserId = 499;
+inline constexpr std::uint32_t firstMobileUserId = 501;
+inline constexpr std::uint32_t lastMobileUserId = 510;
+
+/// Whether `userId` may own containers of the class. Classes outside 1 to 13 have no owner.
+[[nodiscard]] bool userIdIsValidForClass(ContainerClass containerClass, std::uint32_t userId);
+
+class UserIdentity {
+public:
+    UserIdentity(const Log& log, const platform::PasswordDatabase& passwords) : log_(log), passwords_(passwords) {}
+
+    /// The user that a request acts on, or error 38 (logged). `requested` is the low 32 bits of what the client sent.
+    [[nodiscard]] Result<std::uint32_t> validateUserId(std::uint32_t requested, ContainerClass containerClass,
+                                                       std::uint32_t clientUserId);
+    /// The uid of the account "mobile", 0 when there is none. Looked up once; concurrent first callers wait for it.
+    [[nodiscard]] std::uint32_t getCurrentMobileUserId();
+
+private:
+    const Log& log_;
+    const platform::PasswordDatabase& passwords_;
+    std::once_flag lookup_;
+    std::uint32_t mobileUserId_ = 0; // written once inside lookup_, read after it
+};
+
+} // namespace zor

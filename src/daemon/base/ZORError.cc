@@ -1,0 +1,49 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "daemon/base/ZORError.h"
+
+#include <cstring>
+
+namespace zor {
+
+std::string ZORError::text() const {
+    return formatted("%s %d \"%s\"", domain_ == ErrorDomain::zor ? "ZORErrorDomain" : "POSIX", code_,
+                     ZOR_SHOWN(description_));
+}
+
+void logError(const Log& log, const ZORError& error) {
+    if (!error.description())
+        return;
+    if (error.underlying())
+        log.write(logLevelError, error.functionName(), "%d: %s (%s)", error.sourceFileLine(),
+                  error.description()->c_str(), error.underlying()->text().c_str());
+    else
+        log.write(logLevelError, error.functionName(), "%d: %s", error.sourceFileLine(),
+                  error.description()->c_str());
+}
+
+ZORError makeError(const Log& log, Here here, ErrorCode code, const ZORError* underlying, LogFlag flag,
+                   const char* format, ...) {
+    std::va_list arguments;
+    va_start(arguments, format);
+    ZORError error(here, ErrorDomain::zor, static_cast<int>(code), formattedList(format, arguments),
+                   underlying ? std::make_shared<const ZORError>(*underlying) : nullptr);
+    va_end(arguments);
+    if (flag == LogFlag::yes)
+        logError(log, error);
+    return error;
+}
+
+ZORError posixError(Here here, int number, const char* format, ...) {
+    std::va_list arguments;
+    va_start(arguments, format);
+    ZORError error(here, ErrorDomain::posix, number, formattedList(format, arguments));
+    va_end(arguments);
+    return error;
+}
+
+const char* errorText(int number) {
+    const char* text = strerrordesc_np(number);
+    return text ? text : "Unknown error";
+}
+
+} // namespace zor

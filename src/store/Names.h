@@ -1,0 +1,39 @@
+// SPDX-License-Identifier: Apache-2.0
+// Every name that the store has on disk, spelled here and nowhere else.
+#pragma once
+
+#include <array>
+#include <string_view>
+
+namespace zor::names {
+
+// Fixed places, below the system root.
+inline constexpr std::string_view rootHome = "/private/var/root";
+inline constexpr std::string_view brevadHome = "/private/var/brevad";
+inline constexpr std::string_view sharedContainers = "/private/var/containers";
+inline constexpr std::string_view temporary = "/tmp";
+
+// Below a home.
+inline constexpr std::string_view logs = "Library/Logs/Zorvane";
+inline constexpr std::string_view caches = "Library/Caches/com.veltra.zorvaned";
+inline constexpr std::string_view library = "Library/Zorvane";
+inline constexpr std::string_view userContainers = "Containers";
+/// The levels of the caches directory, for where each is made by itself.
+inline constexpr std::array<std::string_view, 3> cachesLevels = {"Library", "Caches", "com.veltra.zorvaned"};
+
+// Below the caches and library directories.
+inline constexpr std::string_view transient = "Temp";
+inline constexpr std::string_view staging = "Staging";
+inline constexpr std::string_view deathrow = "Dead";
+inline constexpr std::string_view replace = "Replace";
+inline constexpr std::string_view bundle = "Bundle";
+
+/// Hidden in every container: whom it belongs to.
+inline constexpr const char* metadataFile = ".com.veltra.zorvane.metadata.plist";
+
+/// In the library directory: what each identifier is entitled to.
+inline constexpr const char* entitlementFile = "zor_entitlements.plist";
+/// What an entitlement file that cannot be read is renamed to; its presence stops every pass that deletes on its word.
+inline constexpr const char* unreadableEntitlementFile = "zor_entitlements.plist.unreadable";
+
+} // namespace zor::names

@@ -1,0 +1,68 @@
+// SPDX-License-Identifier: Apache-2.0
+// Where everything lies that does not belong to one mobile user, and which class directory a container belongs to.
+//
+// A directory getter makes its directory on every call, so one that was moved away is there again at the next; it logs when
+// that fails and returns the place anyway. Whether a user may own a class is its callers' question.
+//
+// One recursive lock is held for a whole getter, directory creation included; it is taken before a per-user one.
+#pragma once
+
+#include "daemon/base/ContainerClass.h"
+#include "daemon/base/FileURL.h"
+#include "fs/ZORFileManager.h"
+#include "platform/Mutex.h"
+#include "platform/Queries.h"
+#include "store/ZORPerUserConfiguration.h"
+
+#include <array>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string_view>
+
+namespace zor {
+
+class ZORGlobalConfiguration {
+public:
+    ZORGlobalConfiguration(const Log& log, ZORFileManager& fileManager, const platform::PasswordDatabase& passwords);
+
+    /// The user's configuration, made at the first call; nullptr outside 501 to 510 (tried and logged again each time).
+    /// Lives as long as this object.
+    ZORPerUserConfiguration* getPerUserConfigurationForUserId(std::uint32_t userId);
+
+    FileURL sharedContainersDirectory();
+    FileURL logDirectory();
+    FileURL cachesDirectory();
+    FileURL libraryDirectory();
+    FileURL transientDirectory();
+    FileURL transientBundleDirectory();
+    FileURL stagingDirectory();
+    FileURL deathrowDirectory();
+    FileURL replaceDirectory();
+    FileURL bundleDirectory();
+    /// DIR/tmp; the system's, not made here.
+    [[nodiscard]] FileURL temporaryDirectory() const { return temporaryDirectory_; }
+
+    /// The class directory, made if missing; absent only for a class or user that has none.
+    std::optional<FileURL> containerDirectoryURLForUser(std::uint32_t userId, ContainerClass containerClass,
+                                                        bool transient);
+
+    /// What a user keeps in an application's data container.
+    [[nodiscard]] static const std::array<std::string_view, 4>& appUserDataItemNames();
+
+private:
+    void makeDirectory(const FileURL& url, const DirectoryAttributes& attributes, const char* function,
+                       const char* what, Intermediates intermediates = Intermediates::yes);
+
+    const Log& log_;
+    ZORFileManager& fileManager_;
+    const platform::PasswordDatabase& passwords_;
+    const FileURL homeDirectory_;
+    const FileURL brevadHomeDirectory_;
+    const FileURL sharedContainersDirectory_;
+    const FileURL temporaryDirectory_;
+    platform::RecursiveMutex lock_;
+    std::map<std::uint32_t, std::unique_ptr<ZORPerUserConfiguration>> perUserConfigurations_ ZOR_GUARDED_BY(lock_);
+};
+
+} // namespace zor

@@ -1,0 +1,47 @@
+// SPDX-License-Identifier: Apache-2.0
+// Where the containers of one mobile user lie. Getters never fail: they make their directory on every call, log when they
+// cannot, and return the place anyway. A home that is not known makes every place below it absent.
+//
+// Its own recursive lock is held for a whole getter. Lock order: the global configuration's lock before this one.
+#pragma once
+
+#include "daemon/base/ContainerClass.h"
+#include "daemon/base/FileURL.h"
+#include "fs/ZORFileManager.h"
+#include "platform/Mutex.h"
+#include "platform/Queries.h"
+
+#include <memory>
+#include <optional>
+
+namespace zor {
+
+class ZORPerUserConfiguration {
+public:
+    /// nullptr, with a log line, for a user id outside 501 to 510.
+    static std::unique_ptr<ZORPerUserConfiguration> initWithUserId(std::uint32_t userId, const Log& log,
+                                                                   ZORFileManager& fileManager,
+                                                                   const platform::PasswordDatabase& passwords);
+
+    [[nodiscard]] std::uint32_t userId() const { return userId_; }
+    [[nodiscard]] const std::optional<FileURL>& userHomeDirectory() const { return userHomeDirectory_; }
+    /// Whether the home exists; makes nothing.
+    [[nodiscard]] bool existsUserBaseDirectory();
+    std::optional<FileURL> userBaseDirectory();
+    std::optional<FileURL> transientDirectory();
+    /// The class directory; absent (logged) for classes that are not per user.
+    std::optional<FileURL> containerDirectoryURLForContentClass(ContainerClass containerClass, bool transient);
+
+private:
+    ZORPerUserConfiguration(std::uint32_t userId, const Log& log, ZORFileManager& fileManager)
+        : userId_(userId), log_(log), fileManager_(fileManager) {}
+    void makeDirectory(const FileURL& url, const char* function, const char* what);
+
+    const std::uint32_t userId_;
+    const Log& log_;
+    ZORFileManager& fileManager_;
+    std::optional<FileURL> userHomeDirectory_; // set before the object is shared
+    platform::RecursiveMutex lock_;
+};
+
+} // namespace zor
