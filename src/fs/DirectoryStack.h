@@ -22,10 +22,6 @@
 
 namespace zor::fs {
 
-/// Opens the directory `name` of `directory` for reading, following no link and crossing no mount point. A descriptor or -errno:
-/// -EXDEV for a mount point, -ENOTDIR or -ELOOP for what is no directory.
-int openDirectoryBeneath(int directory, const char* name);
-
 class DirectoryStack {
 public:
     static constexpr std::size_t openMax = 24;

@@ -23,7 +23,7 @@
 
 namespace zor::fs {
 
-enum class TreeEntryKind {
+enum class WalkEntryKind {
     directory,           ///< before its content
     directoryEnd,        ///< after its content
     unreadableDirectory, ///< in place of directoryEnd: it could not be opened or read to its end; `error` says why
@@ -33,15 +33,15 @@ enum class TreeEntryKind {
     noStatus ///< could not be examined; `error` says why
 };
 
-struct TreeEntry {
-    TreeEntryKind kind = TreeEntryKind::noStatus;
+struct WalkEntry {
+    WalkEntryKind kind = WalkEntryKind::noStatus;
     /// The open directory that holds the entry. All descriptors belong to the walker and are good for this call only.
     int parent = -1;
     /// One component. Who acts on it must be ready to find something else there by now.
     const char* name = nullptr;
     /// For a directory that could be opened: the directory itself. Else -1.
     int directory = -1;
-    /// Of the item, never of what a link points to. With TreeStatus::typeOnly, and on other file systems, only the type in
+    /// Of the item, never of what a link points to. With WalkStatus::typeOnly, and on other file systems, only the type in
     /// st_mode and st_ino mean something.
     struct stat status {};
     int error = 0;
@@ -49,7 +49,7 @@ struct TreeEntry {
     bool onOtherFileSystem = false;
     /// 0 for the root.
     std::size_t depth = 0;
-    /// How often this directory was read before this end of it: 1, and one more after each TreeStep::again.
+    /// How often this directory was read before this end of it: 1, and one more after each WalkStep::again.
     unsigned pass = 0;
 
     /// Relative to the root of the walk; empty for the root. Made on demand.
@@ -58,20 +58,20 @@ struct TreeEntry {
     const DirectoryStack* stack = nullptr;
 };
 
-enum class TreeStep {
+enum class WalkStep {
     proceed,
     skip,  ///< answer to `directory`: do not enter; its end follows at once
     again, ///< answer to `directoryEnd`: read this directory once more from the beginning
     stop
 };
 
-enum class TreeStatus { full, typeOnly };
+enum class WalkStatus { full, typeOnly };
 
 class TreeWalker {
 public:
-    using Visitor = std::function<TreeStep(const TreeEntry&)>;
+    using Visitor = std::function<WalkStep(const WalkEntry&)>;
 
-    explicit TreeWalker(TreeStatus status = TreeStatus::full) : statusWanted_(status) {}
+    explicit TreeWalker(WalkStatus status = WalkStatus::full) : statusWanted_(status) {}
 
     /// Walks from the entry `name` (one component, or "." for `parent` itself) of the open directory `parent`.
     /// 0 at the end; -ECANCELED when the visitor stopped it; another -errno when the root could not be examined (no visit).
@@ -81,14 +81,14 @@ public:
     [[nodiscard]] std::size_t vanishedDirectories() const { return vanishedDirectories_; }
 
 private:
-    TreeStep visitName(const char* name, unsigned char type);
-    TreeStep visitDirectory(TreeEntry& entry);
-    TreeStep visitUnopened(TreeEntry& entry, int error);
-    TreeStep enter(TreeEntry& entry, platform::FileDescriptor directory);
-    TreeStep visitNonDirectory(TreeEntry& entry);
-    TreeStep finishDirectory();
+    WalkStep visitName(const char* name, unsigned char type);
+    WalkStep visitDirectory(WalkEntry& entry);
+    WalkStep visitUnopened(WalkEntry& entry, int error);
+    WalkStep enter(WalkEntry& entry, platform::FileDescriptor directory);
+    WalkStep visitNonDirectory(WalkEntry& entry);
+    WalkStep finishDirectory();
 
-    TreeStatus statusWanted_;
+    WalkStatus statusWanted_;
     const Visitor* visitor_ = nullptr;
     int rootParent_ = -1;
     std::string rootName_;

@@ -36,6 +36,11 @@ std::expected<FileDescriptor, int> openBeneath(int directory, const char* relati
     return resolve(directory, relativePath, flags, mode, RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS);
 }
 
+std::expected<FileDescriptor, int> openBeneathOnMount(int directory, const char* relativePath, int flags) {
+    return resolve(directory, relativePath, flags, 0,
+                   RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS | RESOLVE_NO_XDEV);
+}
+
 std::expected<FileDescriptor, int> openInRoot(int directory, const char* relativePath, int flags) {
     return resolve(directory, relativePath, flags, 0, RESOLVE_IN_ROOT | RESOLVE_NO_MAGICLINKS);
 }

@@ -15,7 +15,10 @@ namespace zor::platform {
 [[nodiscard]] std::expected<FileDescriptor, int> openBeneath(int directory, const char* relativePath, int flags,
                                                              mode_t mode = 0);
 
-/// The same for trees that only root writes to, such as DIR/etc: links are followed, as if `directory` were "/".
+/// The same, and no mount point is crossed, not even one of the same file system: EXDEV. What is mounted there is not asked.
+[[nodiscard]] std::expected<FileDescriptor, int> openBeneathOnMount(int directory, const char* relativePath, int flags);
+
+/// The same as openBeneath for trees that only root writes to, such as DIR/etc: links are followed, as if `directory` were "/".
 [[nodiscard]] std::expected<FileDescriptor, int> openInRoot(int directory, const char* relativePath, int flags);
 
 } // namespace zor::platform
