@@ -217,7 +217,7 @@ std::vector<std::string> referenceFaults(const SourceFile& file) {
     return faults;
 }
 
-/// What a source is for stands in its header; in the source itself where there is none.
+/// What a source is for stands in its header; in the source itself where there is none. Tests say it one by one.
 enum class Purpose { here, inHeader };
 
 std::vector<std::string> formFaults(const SourceFile& file, Purpose purpose) {
@@ -284,7 +284,8 @@ TEST(HouseRules, EverySourceHasItsHead) {
         const std::string header = file.path.substr(0, file.path.rfind('.')) + ".h";
         const bool hasHeader =
             header != file.path && std::ranges::find(files, header, &SourceFile::path) != files.end();
-        append(faults, formFaults(file, hasHeader ? Purpose::inHeader : Purpose::here));
+        const bool isTest = file.path.ends_with("Test.cc");
+        append(faults, formFaults(file, hasHeader || isTest ? Purpose::inHeader : Purpose::here));
     }
     EXPECT_EQ(joined(faults), "");
 }
