@@ -1,0 +1,181 @@
+// SPDX-License-Identifier: Apache-2.0
+// The one-line form of a value. Its text often comes from clients, so nothing in it can end a log line or fill the log:
+// control characters are escaped, and the work stops where the text is full.
+#include "plist/Limits.h"
+#include "plist/Utf8.h"
+#include "plist/Value.h"
+
+#include <charconv>
+
+namespace zor::plist {
+
+namespace {
+
+constexpr std::string_view cutMark = "...";
+constexpr char hexDigits[] = "0123456789abcdef";
+
+/// What ends a line or turns a terminal's mind: C0, DEL, C1, the two line separators of Unicode.
+bool isControl(char32_t c) {
+    return c < 0x20 || (c >= 0x7F && c < 0xA0) || c == 0x2028 || c == 0x2029;
+}
+
+class Describer {
+public:
+    explicit Describer(std::size_t bytesMax) : bytesMax_(bytesMax) {}
+
+    void value(const Value& value, std::size_t depth);
+    std::string finish() &&;
+
+private:
+    [[nodiscard]] bool full() const { return out_.size() > bytesMax_; }
+    void string(std::string_view text);
+    void character(std::string_view bytes, char32_t codePoint);
+    void data(const Data& bytes);
+    void array(const Array& values, std::size_t depth);
+    void dictionary(const Dictionary& entries, std::size_t depth);
+    void real(double number);
+
+    std::string out_;
+    std::size_t bytesMax_;
+};
+
+void Describer::character(std::string_view bytes, char32_t codePoint) {
+    if (codePoint == '"' || codePoint == '\\') {
+        out_ += '\\';
+        out_ += bytes;
+    } else if (codePoint == '\n') {
+        out_ += "\\n";
+    } else if (isControl(codePoint)) {
+        out_ += "\\u";
+        for (int shift = 12; shift >= 0; shift -= 4)
+            out_ += hexDigits[(codePoint >> shift) & 0xFU];
+    } else {
+        out_ += bytes;
+    }
+}
+
+void Describer::string(std::string_view text) {
+    out_ += '"';
+    while (!text.empty() && !full()) {
+        const Utf8Character next = decodeUtf8(text);
+        if (next.length == 0) {
+            const auto byte = static_cast<unsigned char>(text[0]);
+            out_ += "\\x";
+            out_ += hexDigits[byte >> 4];
+            out_ += hexDigits[byte & 0xFU];
+            text.remove_prefix(1);
+        } else {
+            character(text.substr(0, next.length), next.codePoint);
+            text.remove_prefix(next.length);
+        }
+    }
+    out_ += '"';
+}
+
+void Describer::data(const Data& bytes) {
+    out_ += '<';
+    for (const std::uint8_t byte : bytes) {
+        if (full())
+            return;
+        out_ += hexDigits[byte >> 4];
+        out_ += hexDigits[byte & 0xFU];
+    }
+    out_ += '>';
+}
+
+void Describer::array(const Array& values, std::size_t depth) {
+    out_ += '[';
+    const char* separator = "";
+    for (const Value& element : values) {
+        if (full())
+            return;
+        out_ += separator;
+        value(element, depth);
+        separator = ", ";
+    }
+    out_ += ']';
+}
+
+void Describer::dictionary(const Dictionary& entries, std::size_t depth) {
+    out_ += '{';
+    const char* separator = "";
+    for (const auto& [key, element] : entries) {
+        if (full())
+            return;
+        out_ += separator;
+        string(key);
+        out_ += " = ";
+        value(element, depth);
+        separator = ", ";
+    }
+    out_ += '}';
+}
+
+void Describer::real(double number) {
+    char text[32];
+    const auto end = std::to_chars(text, text + sizeof text, number).ptr;
+    out_.append(text, end);
+}
+
+void Describer::value(const Value& value, std::size_t depth) {
+    switch (value.type()) {
+    case Type::boolean:
+        out_ += *value.asBoolean() ? "true" : "false";
+        break;
+    case Type::integer:
+        out_ += std::to_string(*value.asSigned());
+        break;
+    case Type::unsignedInteger:
+        out_ += std::to_string(*value.asUnsigned());
+        break;
+    case Type::real:
+        real(*value.asReal());
+        break;
+    case Type::date:
+        out_ += "date ";
+        real(value.asDate()->secondsSinceReference);
+        break;
+    case Type::string:
+        string(*value.asString());
+        break;
+    case Type::data:
+        data(*value.asData());
+        break;
+    case Type::array:
+        if (depth == nestingMax)
+            out_ += "[...]";
+        else
+            array(*value.asArray(), depth + 1);
+        break;
+    case Type::dictionary:
+        if (depth == nestingMax)
+            out_ += "{...}";
+        else
+            dictionary(*value.asDictionary(), depth + 1);
+        break;
+    }
+}
+
+std::string Describer::finish() && {
+    if (full()) {
+        std::size_t keep = bytesMax_ > cutMark.size() ? bytesMax_ - cutMark.size() : 0;
+        // Not in the middle of a character: its continuation bytes go with it.
+        while (keep > 0 && (static_cast<unsigned char>(out_[keep]) & 0xC0U) == 0x80)
+            --keep;
+        out_.resize(keep);
+        out_.append(cutMark.substr(0, bytesMax_));
+    }
+    return std::move(out_);
+}
+
+} // namespace
+
+std::string describe(const Value* value, std::size_t bytesMax) {
+    if (value == nullptr)
+        return "(null)";
+    Describer describer(bytesMax);
+    describer.value(*value, 0);
+    return std::move(describer).finish();
+}
+
+} // namespace zor::plist

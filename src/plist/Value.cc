@@ -1,0 +1,157 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "plist/Value.h"
+
+#include <algorithm>
+#include <cmath>
+#include <limits>
+
+namespace zor::plist {
+
+namespace {
+
+bool keyIsLess(const Dictionary::Entry& left, const Dictionary::Entry& right) {
+    return left.first < right.first;
+}
+
+/// A number that is none equals itself here: what was stored compares equal to what was asked to be stored.
+bool sameNumber(double left, double right) {
+    return left == right || (std::isnan(left) && std::isnan(right));
+}
+
+template <typename Iterator>
+Iterator lowerBound(Iterator first, Iterator last, std::string_view key) {
+    return std::lower_bound(
+        first, last, key, [](const Dictionary::Entry& entry, std::string_view wanted) { return entry.first < wanted; });
+}
+
+} // namespace
+
+Dictionary::Dictionary() = default;
+
+Dictionary::Dictionary(std::initializer_list<Entry> entries) : Dictionary(fromUnsorted(std::vector<Entry>(entries))) {}
+
+Dictionary Dictionary::fromUnsorted(std::vector<Entry> entries) {
+    const auto notAscending = [](const Entry& left, const Entry& right) { return !keyIsLess(left, right); };
+    if (std::adjacent_find(entries.begin(), entries.end(), notAscending) != entries.end()) {
+        std::stable_sort(entries.begin(), entries.end(), keyIsLess);
+        // Of a run of equal keys only the last stays.
+        std::size_t kept = 0;
+        for (std::size_t at = 0; at < entries.size(); ++at) {
+            if (at + 1 < entries.size() && entries[at].first == entries[at + 1].first)
+                continue;
+            if (kept != at)
+                entries[kept] = std::move(entries[at]);
+            ++kept;
+        }
+        entries.resize(kept);
+    }
+    Dictionary result;
+    result.entries_ = std::move(entries);
+    return result;
+}
+
+std::size_t Dictionary::size() const {
+    return entries_.size();
+}
+
+bool Dictionary::empty() const {
+    return entries_.empty();
+}
+
+Dictionary::const_iterator Dictionary::begin() const {
+    return entries_.begin();
+}
+
+Dictionary::const_iterator Dictionary::end() const {
+    return entries_.end();
+}
+
+const Value* Dictionary::find(std::string_view key) const {
+    const auto found = lowerBound(entries_.begin(), entries_.end(), key);
+    return found != entries_.end() && found->first == key ? &found->second : nullptr;
+}
+
+void Dictionary::set(std::string_view key, Value value) {
+    const auto found = lowerBound(entries_.begin(), entries_.end(), key);
+    if (found != entries_.end() && found->first == key)
+        found->second = std::move(value);
+    else
+        entries_.emplace(found, std::string(key), std::move(value));
+}
+
+bool Dictionary::erase(std::string_view key) {
+    const auto found = lowerBound(entries_.begin(), entries_.end(), key);
+    if (found == entries_.end() || found->first != key)
+        return false;
+    entries_.erase(found);
+    return true;
+}
+
+const std::string* Dictionary::string(std::string_view key) const {
+    const Value* value = find(key);
+    return value != nullptr ? value->asString() : nullptr;
+}
+
+const Data* Dictionary::data(std::string_view key) const {
+    const Value* value = find(key);
+    return value != nullptr ? value->asData() : nullptr;
+}
+
+const Array* Dictionary::array(std::string_view key) const {
+    const Value* value = find(key);
+    return value != nullptr ? value->asArray() : nullptr;
+}
+
+const Dictionary* Dictionary::dictionary(std::string_view key) const {
+    const Value* value = find(key);
+    return value != nullptr ? value->asDictionary() : nullptr;
+}
+
+bool Dictionary::isTrue(std::string_view key) const {
+    const Value* value = find(key);
+    const bool* boolean = value != nullptr ? value->asBoolean() : nullptr;
+    return boolean != nullptr && *boolean;
+}
+
+std::optional<std::uint64_t> Dictionary::unsignedInteger(std::string_view key) const {
+    const Value* value = find(key);
+    return value != nullptr ? value->asUnsigned() : std::nullopt;
+}
+
+bool Dictionary::operator==(const Dictionary& other) const {
+    return entries_ == other.entries_;
+}
+
+Value::Value(std::uint64_t value) {
+    if (value <= static_cast<std::uint64_t>(std::numeric_limits<std::int64_t>::max()))
+        storage_ = static_cast<std::int64_t>(value);
+    else
+        storage_ = value;
+}
+
+std::optional<std::uint64_t> Value::asUnsigned() const {
+    if (const auto* big = std::get_if<std::uint64_t>(&storage_))
+        return *big;
+    if (const auto* number = std::get_if<std::int64_t>(&storage_); number != nullptr && *number >= 0)
+        return static_cast<std::uint64_t>(*number);
+    return std::nullopt;
+}
+
+std::optional<std::int64_t> Value::asSigned() const {
+    // The unsigned alternative only ever holds what does not fit.
+    if (const auto* number = std::get_if<std::int64_t>(&storage_))
+        return *number;
+    return std::nullopt;
+}
+
+bool Value::operator==(const Value& other) const {
+    if (type() != other.type())
+        return false;
+    if (const double* real = asReal())
+        return sameNumber(*real, *other.asReal());
+    if (const Date* date = asDate())
+        return sameNumber(date->secondsSinceReference, other.asDate()->secondsSinceReference);
+    return storage_ == other.storage_;
+}
+
+} // namespace zor::plist
