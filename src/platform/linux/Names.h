@@ -5,6 +5,8 @@
 // ones.
 #pragma once
 
+#include "ipc/Names.h"
+
 namespace zor::platform::names {
 
 // What the daemon reads.
@@ -18,16 +20,17 @@ inline constexpr const char* passwordFile = "etc/passwd";
 // What lives as long as the boot. Single names lie in runtimeDirectory.
 inline constexpr const char* runParent = "run";
 inline constexpr const char* runtimeName = "zorvane";
-inline constexpr const char* runtimeDirectory = "run/zorvane";
-inline constexpr const char* serviceSocket = "com.veltra.zorvaned";
-inline constexpr const char* upcallSocket = "com.veltra.zorvaned.upcall";
-inline constexpr const char* statusSocket = "zorvaned.status";
+inline constexpr const char* runtimeDirectory = ipc::runtimeDirectory.data();
+inline constexpr const char* serviceSocket = ipc::serviceName.data();
+inline constexpr const char* upcallSocket = ipc::upcallServiceName.data();
+inline constexpr const char* statusSocket = ipc::statusSocketName.data();
 inline constexpr const char* lockFile = "zorvaned.lock";
 inline constexpr const char* lockState = "lockstate";
 inline constexpr const char* sandboxDirectory = "sandbox";
 inline constexpr const char* assertionDirectory = "assertions";
 
-// The log directory itself is the store's to name and make; these are its files.
+// The log directory, which the store makes, and its files.
+inline constexpr const char* logDirectory = "private/var/root/Library/Logs/Zorvane";
 inline constexpr const char* logFile = "zorvaned.log";
 inline constexpr const char* crashFile = "zorvaned.crash";
 

@@ -1,0 +1,23 @@
+// SPDX-License-Identifier: Apache-2.0
+// Keeps a second daemon off the same root: run/zorvane/zorvaned.lock, locked for the life of the process. The kernel
+// gives it up when the process ends, however it ends.
+#pragma once
+
+#include "platform/FileDescriptor.h"
+#include "platform/linux/SystemRoot.h"
+
+#include <expected>
+
+namespace zor::platform {
+
+class DaemonLock {
+public:
+    /// EWOULDBLOCK when another daemon holds it, else an errno.
+    [[nodiscard]] static std::expected<DaemonLock, int> take(const SystemRoot& root);
+
+private:
+    explicit DaemonLock(FileDescriptor file) : file_(std::move(file)) {}
+    FileDescriptor file_;
+};
+
+} // namespace zor::platform

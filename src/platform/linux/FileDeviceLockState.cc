@@ -1,0 +1,62 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "platform/linux/FileDeviceLockState.h"
+
+#include "platform/linux/Inotify.h"
+#include "platform/linux/Names.h"
+#include "platform/linux/Openat2.h"
+#include "platform/linux/SmallFile.h"
+
+#include <cerrno>
+#include <charconv>
+#include <fcntl.h>
+#include <sys/inotify.h>
+
+namespace zor::platform {
+
+namespace {
+
+constexpr std::size_t stateBytesMax = 32;
+constexpr std::uint32_t watchedEvents = IN_MOVED_TO | IN_MOVED_FROM | IN_CREATE | IN_DELETE | IN_CLOSE_WRITE;
+
+int parseState(std::string_view text) {
+    if (text.ends_with('\n'))
+        text.remove_suffix(1);
+    int state = FileDeviceLockState::unknown;
+    const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), state);
+    return error == std::errc() && end == text.data() + text.size() ? state : FileDeviceLockState::unknown;
+}
+
+} // namespace
+
+int FileDeviceLockState::currentState() const {
+    const auto file = openBeneath(root_.runtimeDirectory(), names::lockState, O_RDONLY | O_NONBLOCK);
+    if (!file)
+        return file.error() == ENOENT ? 0 : unknown;
+    const auto text = readSmallFile(file->get(), stateBytesMax);
+    return text ? parseState(*text) : unknown;
+}
+
+const char* FileDeviceLockState::notificationName() const {
+    return names::lockState;
+}
+
+int FileDeviceLockState::registerForChanges(RunLoop& loop, std::function<void()> changed) {
+    inotify_.reset(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
+    if (!inotify_.valid())
+        return errno;
+    if (const auto watch = watchDirectory(inotify_.get(), root_.runtimeDirectory(), watchedEvents); !watch)
+        return watch.error();
+    const bool watched = loop.watch(inotify_.get(), [this, changed = std::move(changed)] {
+        if (takeEvents())
+            changed();
+    });
+    return watched ? 0 : ENOMEM;
+}
+
+bool FileDeviceLockState::takeEvents() const {
+    return readInotify(inotify_.get(), [](const inotify_event& event, std::string_view name) {
+        return (event.mask & IN_Q_OVERFLOW) != 0 || name == names::lockState;
+    });
+}
+
+} // namespace zor::platform

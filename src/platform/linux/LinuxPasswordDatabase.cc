@@ -1,0 +1,85 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "platform/linux/LinuxPasswordDatabase.h"
+
+#include "platform/linux/Names.h"
+#include "platform/linux/Openat2.h"
+
+#include <cerrno>
+#include <cstdio>
+#include <fcntl.h>
+#include <memory>
+#include <vector>
+
+namespace zor::platform {
+
+namespace {
+
+constexpr std::size_t entryBytesFirst = 4096;
+constexpr std::size_t entryBytesMax = 64 * 1024;
+
+struct FileCloser {
+    void operator()(std::FILE* file) const { std::fclose(file); }
+};
+
+/// Calls a getpw*_r function with a buffer that grows until the entry fits, and hands the entry on.
+template <typename Lookup, typename Convert>
+std::optional<PasswordEntry> lookUp(Lookup lookup, Convert convert) {
+    std::vector<char> buffer(entryBytesFirst);
+    for (;;) {
+        passwd entry{};
+        passwd* found = nullptr;
+        const int error = lookup(&entry, buffer.data(), buffer.size(), &found);
+        if (error == 0)
+            return found ? convert(*found) : std::nullopt;
+        if (error == EINTR)
+            continue;
+        if (error != ERANGE || buffer.size() >= entryBytesMax)
+            return std::nullopt;
+        buffer.resize(buffer.size() * 2);
+    }
+}
+
+} // namespace
+
+std::optional<PasswordEntry> LinuxPasswordDatabase::entryForUserId(std::uint32_t uid) const {
+    if (!root_.isDeviceRoot())
+        return findInFile([uid](const passwd& entry) { return entry.pw_uid == uid; });
+    return lookUp([uid](auto... rest) { return ::getpwuid_r(uid, rest...); },
+                  [this](const passwd& found) { return entryOf(found); });
+}
+
+std::optional<PasswordEntry> LinuxPasswordDatabase::entryForName(std::string_view name) const {
+    if (!root_.isDeviceRoot())
+        return findInFile([name](const passwd& entry) { return name == entry.pw_name; });
+    return lookUp([text = std::string(name)](auto... rest) { return ::getpwnam_r(text.c_str(), rest...); },
+                  [this](const passwd& found) { return entryOf(found); });
+}
+
+std::optional<PasswordEntry>
+LinuxPasswordDatabase::findInFile(const std::function<bool(const passwd&)>& matches) const {
+    auto opened = openInRoot(root_.descriptor(), names::passwordFile, O_RDONLY | O_NONBLOCK);
+    if (!opened)
+        return std::nullopt;
+    const std::unique_ptr<std::FILE, FileCloser> file(::fdopen(opened->get(), "re"));
+    if (!file)
+        return std::nullopt;
+    (void)opened->release();
+    // A line longer than the buffer ends the search: no entry is that long, and behind it nothing can be trusted.
+    std::vector<char> buffer(entryBytesMax);
+    passwd entry{};
+    passwd* found = nullptr;
+    while (::fgetpwent_r(file.get(), &entry, buffer.data(), buffer.size(), &found) == 0) {
+        if (matches(*found))
+            return entryOf(*found);
+    }
+    return std::nullopt;
+}
+
+std::optional<PasswordEntry> LinuxPasswordDatabase::entryOf(const passwd& found) const {
+    const std::string_view home = found.pw_dir ? found.pw_dir : "";
+    if (!home.starts_with('/'))
+        return std::nullopt;
+    return PasswordEntry{.name = found.pw_name, .uid = found.pw_uid, .homeDirectory = root_.path(home)};
+}
+
+} // namespace zor::platform

@@ -1,0 +1,37 @@
+// SPDX-License-Identifier: Apache-2.0
+// Data-protection classes as decimal numbers in an extended attribute. Nothing is encrypted by it: what the class means
+// is the business of whoever encrypts; the daemon keeps the record and the rule of what a lock takes away.
+//
+// While the device is locked, a set is refused where the class of the file, before or after, is one whose keys are away
+// (1 and 2). Any thread.
+#pragma once
+
+#include "platform/DeviceLockState.h"
+#include "platform/Disk.h"
+#include "platform/FileProtectionClass.h"
+#include "platform/linux/SystemRoot.h"
+
+#include <atomic>
+
+namespace zor::platform {
+
+class XattrProtectionClass final : public FileProtectionClass {
+public:
+    /// Looks once, on the root's runtime directory, whether this process may set attributes that clients cannot: else
+    /// the attribute is one that a file's owner can forge.
+    XattrProtectionClass(const SystemRoot& root, Disk& disk, const DeviceLockState& lockState);
+
+    [[nodiscard]] std::expected<int, int> classOf(int fd) const override;
+    /// EINVAL for a negative class.
+    int setClass(int fd, int protectionClass) override;
+    [[nodiscard]] bool supported() const override { return supported_.load(std::memory_order_relaxed); }
+    [[nodiscard]] const char* attributeName() const { return attribute_; }
+
+private:
+    const char* const attribute_;
+    Disk& disk_;
+    const DeviceLockState& lockState_;
+    std::atomic<bool> supported_{true};
+};
+
+} // namespace zor::platform
