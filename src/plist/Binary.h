@@ -35,5 +35,7 @@ namespace zor::plist {
 /// Writes behind what `out` already holds, so that a frame header and its payload share one buffer. On an error `out`
 /// is unchanged.
 [[nodiscard]] std::expected<void, WriteError> appendBinary(const Value& value, Data& out);
+/// The same for a root that is held as a dictionary, without a copy of it.
+[[nodiscard]] std::expected<void, WriteError> appendBinary(const Dictionary& root, Data& out);
 
 } // namespace zor::plist

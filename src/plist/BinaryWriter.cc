@@ -43,6 +43,7 @@ std::size_t integerBytes(const Value& value) {
 class Measure {
 public:
     bool add(const Value& value, std::size_t nesting);
+    bool add(const Dictionary& entries, std::size_t nesting);
 
     std::size_t objects = 0;
     std::size_t references = 0;
@@ -88,6 +89,13 @@ bool Measure::addContainer(std::size_t count, std::size_t referencesEach, std::s
     return true;
 }
 
+bool Measure::add(const Dictionary& entries, std::size_t nesting) {
+    return addContainer(entries.size(), 2, nesting) &&
+           std::all_of(entries.begin(), entries.end(), [&](const Dictionary::Entry& each) {
+               return addString(each.first) && add(each.second, nesting + 1);
+           });
+}
+
 bool Measure::add(const Value& value, std::size_t nesting) {
     switch (value.type()) {
     case Type::string:
@@ -97,13 +105,8 @@ bool Measure::add(const Value& value, std::size_t nesting) {
         return addContainer(values.size(), 1, nesting) &&
                std::all_of(values.begin(), values.end(), [&](const Value& each) { return add(each, nesting + 1); });
     }
-    case Type::dictionary: {
-        const Dictionary& entries = *value.asDictionary();
-        return addContainer(entries.size(), 2, nesting) &&
-               std::all_of(entries.begin(), entries.end(), [&](const Dictionary::Entry& each) {
-                   return addString(each.first) && add(each.second, nesting + 1);
-               });
-    }
+    case Type::dictionary:
+        return add(*value.asDictionary(), nesting);
     case Type::data:
         bytes += headerBytes(value.asData()->size()) + value.asData()->size();
         break;
@@ -128,7 +131,8 @@ class Writer {
 public:
     Writer(std::uint8_t* start, const Measure& measure);
 
-    void write(const Value& root);
+    template <typename Root>
+    void write(const Root& root);
     [[nodiscard]] static std::size_t size(const Measure& measure) {
         return tableAt(measure) + measure.objects * widthOf(tableAt(measure)) + binary::trailerBytes;
     }
@@ -141,6 +145,7 @@ private:
     }
 
     void writeObject(const Value& value);
+    void writeObject(const Dictionary& entries) { writeDictionary(entries); }
     void writeString(const std::string& text);
     void writeInteger(const Value& value);
     void writeArray(const Array& values);
@@ -179,7 +184,8 @@ Writer::Writer(std::uint8_t* start, const Measure& measure)
     : start_(start), at_(start), table_(start + tableAt(measure)), objects_(measure.objects),
       offsetWidth_(widthOf(tableAt(measure))), referenceWidth_(widthOf(measure.objects)) {}
 
-void Writer::write(const Value& root) {
+template <typename Root>
+void Writer::write(const Root& root) {
     putBytes(binary::magic.data(), binary::magic.size());
     writeObject(root);
     // What was measured and what was written are one size, or memory is already damaged.
@@ -312,16 +318,25 @@ void Writer::writeDictionary(const Dictionary& entries) {
     }
 }
 
-} // namespace
-
-std::expected<void, WriteError> appendBinary(const Value& value, Data& out) {
+template <typename Root>
+std::expected<void, WriteError> append(const Root& root, Data& out) {
     Measure measure;
-    if (!measure.add(value, 0))
+    if (!measure.add(root, 0))
         return std::unexpected(WriteError{measure.reason});
     const std::size_t before = out.size();
     out.resize(before + Writer::size(measure));
-    Writer(out.data() + before, measure).write(value);
+    Writer(out.data() + before, measure).write(root);
     return {};
+}
+
+} // namespace
+
+std::expected<void, WriteError> appendBinary(const Value& value, Data& out) {
+    return append(value, out);
+}
+
+std::expected<void, WriteError> appendBinary(const Dictionary& root, Data& out) {
+    return append(root, out);
 }
 
 std::expected<Data, WriteError> writeBinary(const Value& value) {
