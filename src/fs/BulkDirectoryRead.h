@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // The entries of an open directory, as many at a time as fit a caller's buffer (getdents64).
 //
-// "." and ".." are left out. A directory that was removed meanwhile has no entries; that is no error. Entries that others add
-// or remove while it is read may be seen or not; every other entry is seen exactly once. The descriptor and the buffer belong
-// to the caller and have to outlive the reader. One thread at a time.
+// "." and ".." are left out. A directory that was removed meanwhile has no entries; that is no error. Entries that
+// others add or remove while it is read may be seen or not; every other entry is seen exactly once. The descriptor and
+// the buffer belong to the caller and have to outlive the reader. One thread at a time.
 #pragma once
 
 #include <array>
@@ -35,7 +35,8 @@ public:
     const Entry* next();
     /// 0, or the errno of the read that ended the entries.
     [[nodiscard]] int error() const { return error_; }
-    /// Where the entry after the last one given begins. Good for seek(), on this or another descriptor of the same directory.
+    /// Where the entry after the last one given begins. Good for seek(), on this or another descriptor of the same
+    /// directory.
     [[nodiscard]] off_t position() const { return position_; }
     /// Goes on at a position; 0 is the beginning. 0 or -errno.
     int seek(off_t position);

@@ -1,10 +1,11 @@
 // SPDX-License-Identifier: Apache-2.0
 // The directories from the root of a walk down to where it is, with a bounded number of them open.
 //
-// Invariants: the root and the deepest level are open; of the others, levels are closed only when more than openMax levels
-// below them were entered. Every level remembers its inode number, its name, and how far it was read. A level that was closed
-// is opened again only as the same inode of the same file system: by ".." of the level below it, else by names from the root.
-// So nobody who moves directories about can make a walk go on in a directory it did not come from.
+// Invariants: the root and the deepest level are open; of the others, levels are closed only when more than openMax
+// levels below them were entered. Every level remembers its inode number, its name, and how far it was read. A level
+// that was closed is opened again only as the same inode of the same file system: by ".." of the level below it, else
+// by names from the root. So nobody who moves directories about can make a walk go on in a directory it did not come
+// from.
 //
 // Memory grows with the length of the path. One thread.
 #pragma once
@@ -13,6 +14,7 @@
 #include "platform/FileDescriptor.h"
 
 #include <array>
+#include <cstdint>
 #include <memory>
 #include <optional>
 #include <string>
@@ -42,6 +44,7 @@ public:
     bool ensureParent(std::size_t& levelsLost);
 
     [[nodiscard]] int top() const { return descriptor(levels_.size() - 1); }
+    [[nodiscard]] int root() const { return descriptor(0); }
     /// The level above the deepest one; only after ensureParent() said true.
     [[nodiscard]] int parent() const { return descriptor(levels_.size() - 2); }
 
@@ -51,9 +54,11 @@ public:
     void rewind();
     /// How often the deepest level was begun to be read.
     [[nodiscard]] unsigned pass() const { return levels_.back().pass; }
+    /// Counts the entries of the deepest level from 0, in each pass anew.
+    std::uint64_t nextIndex() { return levels_.back().entries++; }
 
     /// Name of the deepest level; empty for the root.
-    [[nodiscard]] std::string name() const;
+    [[nodiscard]] std::string name() const { return std::string(nameOf(levels_.size() - 1)); }
     /// Path of the deepest level relative to the root, "" for the root itself.
     [[nodiscard]] const std::string& path() const { return path_; }
     [[nodiscard]] dev_t device() const { return device_; }
@@ -65,6 +70,7 @@ private:
         off_t resume = 0;
         /// Length of the path up to and with this level's name.
         std::size_t pathBytes = 0;
+        std::uint64_t entries = 0;
         unsigned pass = 1;
     };
     struct Slot {
@@ -74,14 +80,15 @@ private:
         std::optional<BulkDirectoryRead> reader;
     };
 
+    [[nodiscard]] static std::size_t slotOf(std::size_t level) { return level == 0 ? 0 : 1 + (level - 1) % openMax; }
+    /// -1 while the level is closed.
     [[nodiscard]] int descriptor(std::size_t level) const;
-    [[nodiscard]] Slot& slot(std::size_t level);
-    [[nodiscard]] const Slot& slot(std::size_t level) const;
     [[nodiscard]] std::string_view nameOf(std::size_t level) const;
     [[nodiscard]] bool isLevel(int directory, std::size_t level) const;
     void install(std::size_t level, platform::FileDescriptor directory);
     void truncate(std::size_t levels);
-    std::size_t reopenFromRoot(std::size_t levels);
+    /// Opens levels 1 to `last` by their names; the number of levels, the root included, that are where they were.
+    std::size_t reopenFromRoot(std::size_t last);
 
     dev_t device_ = 0;
     std::vector<Level> levels_;

@@ -1,10 +1,11 @@
 // SPDX-License-Identifier: Apache-2.0
 // Allocated bytes of every non-directory below a directory, each hard-linked file counted once.
 //
-// Breadth first, one bulk read buffer for all directories, no recursion. The queue of directories is bounded; what does not fit it,
-// and what lies deeper than a path can name, is measured depth first on the spot, so width and depth are bounded by nothing. The set
-// of files seen grows only with files whose link count is not 1. Links are not followed and other file systems not entered.
-// Never fails: what cannot be read adds nothing and is said in the log. Any thread, any number at once.
+// Breadth first, one bulk read buffer for all directories, no recursion. The queue of directories is bounded; what does
+// not fit it, and what lies deeper than a path can name, is measured depth first on the spot, so width and depth are
+// bounded by nothing. The set of files seen grows only with files whose link count is not 1. Links are not followed and
+// other file systems not entered. Never fails: what cannot be read adds nothing and is said in the log. Any thread, any
+// number at once.
 #pragma once
 
 #include <cstdint>
@@ -20,7 +21,7 @@ struct UsageLog {
     int levelMax = 3;
 };
 
-/// `path` names the open directory in messages and serves nothing else. The directory's offset is moved.
+/// `path` names the directory, open for reading, in messages and serves nothing else. Its offset is moved.
 std::uint64_t diskUsage(int directory, const std::string& path, const UsageLog& log);
 
 } // namespace zor::fs

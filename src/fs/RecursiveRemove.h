@@ -1,10 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 // Removes an item and, when it is a directory, everything below it.
 //
-// Works inside trees that others own and change meanwhile: links are removed, never followed; what lies on another file system
-// is left (its mount point then cannot be removed: EBUSY); a name that is gone is as good as removed; names that are
-// added meanwhile are removed too, within a limit. Any depth and width, see fs/TreeWalker.h. Nothing outside the tree is touched:
-// the directory that holds the root only loses the root's name.
+// Works inside trees that others own and change meanwhile: links are removed, never followed; what lies on another file
+// system is left (its mount point then cannot be removed: EBUSY); a name that is gone is as good as removed; names that
+// are added meanwhile are removed too, within a limit. Any depth and width, see fs/TreeWalker.h. Nothing outside the
+// tree is touched: the directory that holds the root only loses the root's name.
 //
 // An interruption leaves a smaller tree under the root's name. Nothing is synced. Any thread.
 #pragma once
@@ -28,23 +28,23 @@ struct RemoveFailure {
 enum class RemoveAnswer { proceed, stop };
 
 struct RemoveCallbacks {
-    /// Called for every item that cannot be removed, directories that stay because something in them stayed included. It
-    /// may repair and remove the item itself: what holds it is then removed as if nothing had happened. Required.
+    /// Called for every item that cannot be removed, directories that stay because something in them stayed included.
+    /// It may repair and remove the item itself: what holds it is then removed as if nothing had happened. Required.
     std::function<RemoveAnswer(const RemoveFailure&)> failed;
-    /// Told, with its path as above, of each directory below the root whose immutable or append-only flag was in the way
-    /// and was cleared. Optional.
+    /// Told, with its path as above, of each directory below the root whose immutable or append-only flag was in the
+    /// way and was cleared. Optional.
     std::function<void(const std::string& path)> directoryMadeMutable;
 };
 
-/// 0 when everything was removed or answered for by `failed`; -ENOENT when there is no such item; after the answer `stop`, the
-/// negative error that was answered so; another -errno when the root could not be examined.
+/// 0 when everything was removed or answered for by `failed`; -ENOENT when there is no such item; after the answer
+/// `stop`, the negative error that was answered so; another -errno when the root could not be examined.
 int removeTree(platform::Disk& disk, int directory, const char* name, const RemoveCallbacks& callbacks);
 
 /// Removes what can be removed. 0, or the first error that kept an item, as -errno.
 int removeTree(platform::Disk& disk, int directory, const char* name);
 
-/// Clears the immutable flag, and only that one, of a regular file or directory. 1 when it was set and is cleared, 0 when it was
-/// not set (as on anything that cannot have it, links among them), or -errno.
+/// Clears the immutable flag, and only that one, of a regular file or directory. 1 when it was set and is cleared, 0
+/// when it was not set (as on anything that cannot have it, links among them), or -errno.
 int clearImmutable(platform::Disk& disk, int directory, const char* name);
 
 } // namespace zor::fs

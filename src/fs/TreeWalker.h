@@ -1,15 +1,15 @@
 // SPDX-License-Identifier: Apache-2.0
 // Visits every item of a tree, the root first, without following links and without leaving the root's file system.
 //
-// The trees belong to others, who change them while they are walked. So every step starts from a directory that is open; a
-// name that is gone when its turn comes counts as never having been there; a name that became something else is visited as
-// what it is now. A directory is visited before and after its content. A mount point, or a subvolume, is visited before and
-// after but not entered, and nothing of what lies on it is asked.
+// The trees belong to others, who change them while they are walked. So every step starts from a directory that is
+// open; a name that is gone when its turn comes counts as never having been there; a name that became something else is
+// visited as what it is now. A directory is visited before and after its content. A mount point, or a subvolume, is
+// visited before and after but not entered, and nothing of what lies on it is asked.
 //
-// Any depth and any width: at most DirectoryStack::openMax + 2 descriptors, no recursion, and memory that grows with the
-// length of the current path alone. A directory whose descriptor had to be closed is found again by ".." and must be
-// the same inode as before; else by its names from the root, each of them checked; else it counts as vanished, with what was
-// not yet visited in it.
+// Any depth and any width: at most DirectoryStack::openMax + 2 descriptors, no recursion, and memory that grows with
+// the length of the current path alone. A directory whose descriptor had to be closed is found again by ".." and must
+// be the same inode as before; else by its names from the root, each of them checked; else it counts as vanished, with
+// what was not yet visited in it.
 //
 // The visitor may remove, rename and change items. One walk at a time for an object, in one thread.
 #pragma once
@@ -17,6 +17,7 @@
 #include "fs/DirectoryStack.h"
 
 #include <cstddef>
+#include <cstdint>
 #include <functional>
 #include <string>
 #include <sys/stat.h>
@@ -41,14 +42,16 @@ struct WalkEntry {
     const char* name = nullptr;
     /// For a directory that could be opened: the directory itself. Else -1.
     int directory = -1;
-    /// Of the item, never of what a link points to. With WalkStatus::typeOnly, and on other file systems, only the type in
-    /// st_mode and st_ino mean something.
-    struct stat status {};
+    /// Of the item, never of what a link points to. With WalkStatus::typeOnly, and on other file systems, only the type
+    /// in st_mode and st_ino mean something.
+    struct stat status{};
     int error = 0;
     /// Lies on another file system than the root: leave it alone.
     bool onOtherFileSystem = false;
     /// 0 for the root.
     std::size_t depth = 0;
+    /// Counts the entries of the directory that holds the entry, from 0 in each pass. Not for directoryEnd.
+    std::uint64_t index = 0;
     /// How often this directory was read before this end of it: 1, and one more after each WalkStep::again.
     unsigned pass = 0;
 
@@ -74,25 +77,31 @@ public:
     explicit TreeWalker(WalkStatus status = WalkStatus::full) : statusWanted_(status) {}
 
     /// Walks from the entry `name` (one component, or "." for `parent` itself) of the open directory `parent`.
-    /// 0 at the end; -ECANCELED when the visitor stopped it; another -errno when the root could not be examined (no visit).
+    /// 0 at the end; -ECANCELED when the visitor stopped it; another -errno when the root could not be examined (no
+    /// visit).
     int walk(int parent, const char* name, const Visitor& visitor);
 
-    /// How many directories of the last walk were moved or replaced so that they could not be finished. Those had no end visit.
+    /// How many directories of the last walk were moved or replaced so that they could not be finished. Those had no
+    /// end visit.
     [[nodiscard]] std::size_t vanishedDirectories() const { return vanishedDirectories_; }
 
 private:
-    WalkStep visitName(const char* name, unsigned char type);
-    WalkStep visitDirectory(WalkEntry& entry);
+    WalkStep visitRoot();
+    WalkStep visitName(WalkEntry entry, unsigned char type);
+    WalkStep visitDirectory(WalkEntry& entry, platform::FileDescriptor directory);
     WalkStep visitUnopened(WalkEntry& entry, int error);
-    WalkStep enter(WalkEntry& entry, platform::FileDescriptor directory);
+    WalkStep visitMountPoint(WalkEntry& entry);
     WalkStep visitNonDirectory(WalkEntry& entry);
     WalkStep finishDirectory();
+    [[nodiscard]] bool atRoot() const { return stack_.empty(); }
 
     WalkStatus statusWanted_;
     const Visitor* visitor_ = nullptr;
     int rootParent_ = -1;
     std::string rootName_;
     dev_t device_ = 0;
+    /// Why the root could not be examined.
+    int rootError_ = 0;
     std::size_t vanishedDirectories_ = 0;
     DirectoryStack stack_;
 };

@@ -1,0 +1,238 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "fs/DiskUsage.h"
+
+#include "daemon/base/Log.h"
+#include "daemon/base/ZORError.h"
+#include "fs/BulkDirectoryRead.h"
+#include "fs/TreeWalker.h"
+#include "platform/linux/Openat2.h"
+
+#include <cerrno>
+#include <climits>
+#include <deque>
+#include <dirent.h>
+#include <fcntl.h>
+#include <linux/magic.h>
+#include <optional>
+#include <sys/stat.h>
+#include <sys/vfs.h>
+#include <unordered_set>
+
+namespace zor::fs {
+
+using platform::FileDescriptor;
+
+namespace {
+
+// What may wait at once; beyond it a directory is measured when it is met.
+constexpr std::size_t queuedDirectoriesMax = 65'536;
+constexpr std::size_t queuedBytesMax = 16 * 1024 * 1024;
+constexpr std::uint64_t blockBytes = 512;
+constexpr std::uint32_t xfsMagic = 0x58465342;
+
+/// The greatest size that a directory without entries has, on file systems whose directories with entries are all
+/// larger. There a status tells what would else take an open and a read.
+std::optional<off_t> emptyDirectoryBytes(int directory) {
+    struct statfs status{};
+    if (::fstatfs(directory, &status) != 0)
+        return std::nullopt;
+    switch (static_cast<std::uint32_t>(status.f_type)) {
+    case BTRFS_SUPER_MAGIC:
+        return 0;
+    case xfsMagic:
+        return 10;
+    case TMPFS_MAGIC:
+        return 40;
+    default:
+        return std::nullopt;
+    }
+}
+
+std::string joined(const std::string& path, const char* name) {
+    return path.empty() ? std::string(name) : path + '/' + name;
+}
+
+class Measurement {
+public:
+    Measurement(int root, const std::string& rootPath, const UsageLog& log)
+        : root_(root), rootPath_(rootPath), log_(log), emptyBytes_(emptyDirectoryBytes(root)) {}
+
+    std::uint64_t run();
+
+private:
+    void measureDirectory(const std::string& path);
+    void measureEntries(int directory, const std::string& path);
+    void addDirectory(int directory, const std::string& path, const char* name);
+    /// `makePath` is called only for a message.
+    template <typename MakePath>
+    void addNonDirectory(const struct stat& status, MakePath makePath);
+    void measureDepthFirst(int parent, const std::string& path, const char* name);
+    void addWalkEntry(const WalkEntry& entry, const std::string& top);
+
+    void sayUnopened(const std::string& path, int error) const;
+    void sayUnexamined(const std::string& path, std::uint64_t index, int error) const;
+    void sayEmpty(const std::string& path) const;
+    [[nodiscard]] bool logs(int level) const { return log_.write && level <= log_.levelMax; }
+    [[nodiscard]] std::string fullPath(const std::string& path) const {
+        return path.empty() ? rootPath_ : rootPath_ + '/' + path;
+    }
+
+    const int root_;
+    const std::string& rootPath_;
+    const UsageLog& log_;
+    const std::optional<off_t> emptyBytes_;
+    dev_t device_ = 0;
+    std::uint64_t total_ = 0;
+    std::unordered_set<ino_t> seen_;
+    /// Relative to the root, which is "".
+    std::deque<std::string> queue_;
+    std::size_t queuedBytes_ = 0;
+    BulkDirectoryRead::Buffer buffer_;
+};
+
+std::uint64_t Measurement::run() {
+    struct stat status{};
+    if (::fstat(root_, &status) != 0 || ::lseek(root_, 0, SEEK_SET) < 0) {
+        sayUnopened({}, errno);
+        return 0;
+    }
+    device_ = status.st_dev;
+    queue_.emplace_back();
+    while (!queue_.empty()) {
+        const std::string path = std::move(queue_.front());
+        queue_.pop_front();
+        queuedBytes_ -= path.size();
+        measureDirectory(path);
+    }
+    return total_;
+}
+
+void Measurement::measureDirectory(const std::string& path) {
+    if (path.empty()) {
+        measureEntries(root_, path);
+        return;
+    }
+    const auto directory = platform::openBeneathOnMount(root_, path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
+    if (!directory) {
+        // A mount point is not part of the tree.
+        if (directory.error() != EXDEV)
+            sayUnopened(path, directory.error());
+        return;
+    }
+    struct stat status{};
+    if (::fstat(directory->get(), &status) == 0 && status.st_dev == device_)
+        measureEntries(directory->get(), path);
+}
+
+void Measurement::measureEntries(int directory, const std::string& path) {
+    BulkDirectoryRead entries(directory, buffer_);
+    std::uint64_t index = 0;
+    for (; const BulkDirectoryRead::Entry* entry = entries.next(); ++index) {
+        struct stat status{};
+        if (entry->type == DT_DIR && !emptyBytes_) {
+            addDirectory(directory, path, entry->name);
+        } else if (::fstatat(directory, entry->name, &status, AT_SYMLINK_NOFOLLOW) != 0) {
+            sayUnexamined(path, index, errno);
+        } else if (status.st_dev != device_) {
+            continue;
+        } else if (!S_ISDIR(status.st_mode)) {
+            addNonDirectory(status, [&] { return joined(path, entry->name); });
+        } else if (emptyBytes_ && status.st_size <= *emptyBytes_) {
+            if (logs(logLevelDebug))
+                sayEmpty(joined(path, entry->name));
+        } else {
+            addDirectory(directory, path, entry->name);
+        }
+    }
+    if (entries.error() != 0 && logs(logLevelError))
+        log_.write(logLevelError,
+                   formatted("scanbatch on entry %llu in %s returned error %s", static_cast<unsigned long long>(index),
+                             ZOR_SHOWN(fullPath(path)), errorText(entries.error())));
+    // Where only the reading tells that there is nothing, this is when it is known.
+    if (index == 0 && entries.error() == 0 && !path.empty() && logs(logLevelDebug))
+        sayEmpty(path);
+}
+
+void Measurement::addDirectory(int directory, const std::string& path, const char* name) {
+    std::string child = joined(path, name);
+    if (child.size() >= PATH_MAX || queue_.size() >= queuedDirectoriesMax ||
+        queuedBytes_ + child.size() > queuedBytesMax) {
+        measureDepthFirst(directory, path, name);
+        return;
+    }
+    queuedBytes_ += child.size();
+    queue_.push_back(std::move(child));
+}
+
+template <typename MakePath>
+void Measurement::addNonDirectory(const struct stat& status, MakePath makePath) {
+    if (status.st_nlink == 1 || seen_.insert(status.st_ino).second)
+        total_ += static_cast<std::uint64_t>(status.st_blocks) * blockBytes;
+    else if (logs(logLevelDebug))
+        log_.write(logLevelDebug, formatted("Skipping hardlinked file at %s", ZOR_SHOWN(fullPath(makePath()))));
+}
+
+void Measurement::measureDepthFirst(int parent, const std::string& path, const char* name) {
+    const std::string top = joined(path, name);
+    const auto directory = platform::openBeneathOnMount(parent, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
+    struct stat status{};
+    if (!directory) {
+        if (directory.error() != EXDEV)
+            sayUnopened(top, directory.error());
+        return;
+    }
+    if (::fstat(directory->get(), &status) != 0 || status.st_dev != device_)
+        return;
+    TreeWalker walker(WalkStatus::full);
+    const int result = walker.walk(directory->get(), ".", [&](const WalkEntry& entry) {
+        addWalkEntry(entry, top);
+        return WalkStep::proceed;
+    });
+    if (result < 0)
+        sayUnopened(top, -result);
+}
+
+void Measurement::addWalkEntry(const WalkEntry& entry, const std::string& top) {
+    if (entry.onOtherFileSystem)
+        return;
+    const auto path = [&] { return entry.depth == 0 ? top : top + '/' + entry.path(); };
+    switch (entry.kind) {
+    case WalkEntryKind::directory:
+    case WalkEntryKind::directoryEnd:
+        return;
+    case WalkEntryKind::unreadableDirectory:
+        sayUnopened(path(), entry.error);
+        return;
+    case WalkEntryKind::noStatus: {
+        const std::string whole = path();
+        sayUnexamined(whole.substr(0, whole.rfind('/')), entry.index, entry.error);
+        return;
+    }
+    default:
+        addNonDirectory(entry.status, path);
+    }
+}
+
+void Measurement::sayUnopened(const std::string& path, int error) const {
+    if (logs(logLevelError))
+        log_.write(logLevelError,
+                   formatted("Failed to open directory %s : %s", ZOR_SHOWN(fullPath(path)), errorText(error)));
+}
+
+void Measurement::sayUnexamined(const std::string& path, std::uint64_t index, int error) const {
+    if (logs(logLevelError))
+        log_.write(logLevelError, formatted("Got error %s while processing entry %llu in %s", errorText(error),
+                                            static_cast<unsigned long long>(index), ZOR_SHOWN(fullPath(path))));
+}
+
+void Measurement::sayEmpty(const std::string& path) const {
+    log_.write(logLevelDebug, formatted("skipping empty directory at %s", ZOR_SHOWN(fullPath(path))));
+}
+
+} // namespace
+
+std::uint64_t diskUsage(int directory, const std::string& path, const UsageLog& log) {
+    return Measurement(directory, path, log).run();
+}
+
+} // namespace zor::fs

@@ -1,0 +1,201 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "fs/RecursiveRemove.h"
+
+#include "fs/TreeWalker.h"
+#include "platform/linux/Openat2.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <fcntl.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <sys/stat.h>
+
+namespace zor::fs {
+
+namespace {
+
+/// How often a directory is read again because names came into it, and a root that changes its kind is tried again.
+constexpr unsigned passesMax = 64;
+
+/// 1 when one of `unwanted` was set and all of them are cleared, 0 when none was, or -errno.
+int clearInodeFlags(platform::Disk& disk, int fd, int unwanted) {
+    int flags = 0;
+    if (::ioctl(fd, FS_IOC_GETFLAGS, &flags) != 0)
+        return errno == ENOTTY || errno == EOPNOTSUPP || errno == ENOSYS ? 0 : -errno;
+    if ((flags & unwanted) == 0)
+        return 0;
+    const int result = disk.setInodeFlags(fd, flags & ~unwanted);
+    return result < 0 ? result : 1;
+}
+
+class Remover {
+public:
+    Remover(platform::Disk& disk, const RemoveCallbacks& callbacks) : disk_(disk), callbacks_(callbacks) {}
+
+    int remove(int directory, const char* name);
+
+private:
+    WalkStep visit(const WalkEntry& entry);
+    WalkStep removeFile(const WalkEntry& entry);
+    WalkStep removeDirectory(const WalkEntry& entry);
+    WalkStep changed(const WalkEntry& entry, int error);
+    WalkStep failed(const WalkEntry& entry, int error);
+    bool makeParentMutable(const WalkEntry& entry);
+    bool makeMutable(int directory, const std::string& path);
+    [[nodiscard]] static bool stillNamed(const WalkEntry& entry);
+
+    platform::Disk& disk_;
+    const RemoveCallbacks& callbacks_;
+    int stopError_ = 0;
+    /// Why the root has to be looked at once more, or 0.
+    int rootChanged_ = 0;
+    /// Directories of the current path up to this depth hold something that could not be removed; -1: none does.
+    long doomedDepth_ = -1;
+};
+
+int Remover::remove(int directory, const char* name) {
+    TreeWalker walker(WalkStatus::typeOnly);
+    const TreeWalker::Visitor visitor = [this](const WalkEntry& entry) { return visit(entry); };
+    for (unsigned pass = 1;; ++pass) {
+        rootChanged_ = 0;
+        doomedDepth_ = -1;
+        const int result = walker.walk(directory, name, visitor);
+        if (result == -ECANCELED)
+            return -stopError_;
+        if (result == -ENOENT && pass > 1)
+            return 0;
+        if (result < 0 || rootChanged_ == 0)
+            return result;
+        if (pass == passesMax) {
+            const RemoveFailure failure{.error = rootChanged_, .parent = directory, .name = name};
+            return callbacks_.failed(failure) == RemoveAnswer::stop ? -failure.error : 0;
+        }
+    }
+}
+
+WalkStep Remover::visit(const WalkEntry& entry) {
+    switch (entry.kind) {
+    case WalkEntryKind::directory:
+        // What was doomed at this depth was a directory before this one.
+        doomedDepth_ = std::min(doomedDepth_, static_cast<long>(entry.depth) - 1);
+        return WalkStep::proceed;
+    case WalkEntryKind::directoryEnd:
+    case WalkEntryKind::unreadableDirectory:
+        return removeDirectory(entry);
+    default:
+        return removeFile(entry);
+    }
+}
+
+WalkStep Remover::removeFile(const WalkEntry& entry) {
+    int result = disk_.unlinkFile(entry.parent, entry.name);
+    if (result == -EPERM && makeParentMutable(entry))
+        result = disk_.unlinkFile(entry.parent, entry.name);
+    if (result == 0 || result == -ENOENT)
+        return WalkStep::proceed;
+    return result == -EISDIR ? changed(entry, EISDIR) : failed(entry, -result);
+}
+
+WalkStep Remover::removeDirectory(const WalkEntry& entry) {
+    int result = disk_.removeDirectory(entry.parent, entry.name);
+    if (result == -EPERM && makeParentMutable(entry))
+        result = disk_.removeDirectory(entry.parent, entry.name);
+    if (result == -EPERM && entry.directory >= 0 && makeMutable(entry.directory, entry.path()))
+        result = disk_.removeDirectory(entry.parent, entry.name);
+    const bool doomed = doomedDepth_ >= static_cast<long>(entry.depth);
+    doomedDepth_ = std::min(doomedDepth_, static_cast<long>(entry.depth) - 1);
+    if (result == 0 || result == -ENOENT)
+        return WalkStep::proceed;
+    if (result == -ENOTDIR)
+        return changed(entry, ENOTDIR);
+    if (result != -ENOTEMPTY && result != -EEXIST)
+        return failed(entry, -result);
+    if (entry.directory >= 0 && !stillNamed(entry))
+        return changed(entry, ENOTEMPTY);
+    if (entry.kind == WalkEntryKind::directoryEnd && entry.directory >= 0 && !doomed && entry.pass < passesMax)
+        return WalkStep::again;
+    return failed(entry, entry.error != 0 ? entry.error : ENOTEMPTY);
+}
+
+/// Something else took the name meanwhile. Its directory, not being empty, is read again and finds it.
+WalkStep Remover::changed(const WalkEntry& entry, int error) {
+    if (entry.depth == 0)
+        rootChanged_ = error;
+    return WalkStep::proceed;
+}
+
+WalkStep Remover::failed(const WalkEntry& entry, int error) {
+    const RemoveAnswer answer =
+        callbacks_.failed({.path = entry.path(), .error = error, .parent = entry.parent, .name = entry.name});
+    if (answer == RemoveAnswer::stop) {
+        stopError_ = error;
+        return WalkStep::stop;
+    }
+    struct stat status{};
+    const bool repaired = ::fstatat(entry.parent, entry.name, &status, AT_SYMLINK_NOFOLLOW) != 0 && errno == ENOENT;
+    if (!repaired)
+        doomedDepth_ = std::max(doomedDepth_, static_cast<long>(entry.depth) - 1);
+    return WalkStep::proceed;
+}
+
+bool Remover::makeParentMutable(const WalkEntry& entry) {
+    // The directory that holds the root is not ours to change.
+    if (entry.depth == 0)
+        return false;
+    const std::string path = entry.path();
+    const std::size_t slash = path.rfind('/');
+    return makeMutable(entry.parent, slash == std::string::npos ? std::string() : path.substr(0, slash));
+}
+
+bool Remover::makeMutable(int directory, const std::string& path) {
+    if (clearInodeFlags(disk_, directory, FS_IMMUTABLE_FL | FS_APPEND_FL) != 1)
+        return false;
+    if (callbacks_.directoryMadeMutable)
+        callbacks_.directoryMadeMutable(path);
+    return true;
+}
+
+bool Remover::stillNamed(const WalkEntry& entry) {
+    struct stat named{};
+    struct stat opened{};
+    return ::fstatat(entry.parent, entry.name, &named, AT_SYMLINK_NOFOLLOW) == 0 &&
+           ::fstat(entry.directory, &opened) == 0 && named.st_dev == opened.st_dev && named.st_ino == opened.st_ino;
+}
+
+} // namespace
+
+int removeTree(platform::Disk& disk, int directory, const char* name, const RemoveCallbacks& callbacks) {
+    return Remover(disk, callbacks).remove(directory, name);
+}
+
+int removeTree(platform::Disk& disk, int directory, const char* name) {
+    int firstError = 0;
+    RemoveCallbacks callbacks;
+    callbacks.failed = [&](const RemoveFailure& failure) {
+        if (firstError == 0)
+            firstError = failure.error;
+        return RemoveAnswer::proceed;
+    };
+    const int result = removeTree(disk, directory, name, callbacks);
+    return result < 0 ? result : -firstError;
+}
+
+int clearImmutable(platform::Disk& disk, int directory, const char* name) {
+    // Only files and directories have inode flags; the same request to a device's driver could mean anything.
+    struct stat status{};
+    if (::fstatat(directory, name, &status, AT_SYMLINK_NOFOLLOW) != 0)
+        return -errno;
+    if (!S_ISREG(status.st_mode) && !S_ISDIR(status.st_mode))
+        return 0;
+    const auto item = platform::openBeneathOnMount(directory, name, O_RDONLY | O_NONBLOCK | O_NOCTTY | O_NOFOLLOW);
+    if (!item)
+        return -item.error();
+    if (::fstat(item->get(), &status) != 0)
+        return -errno;
+    if (!S_ISREG(status.st_mode) && !S_ISDIR(status.st_mode))
+        return 0;
+    return clearInodeFlags(disk, item->get(), FS_IMMUTABLE_FL);
+}
+
+} // namespace zor::fs

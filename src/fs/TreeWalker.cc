@@ -1,0 +1,181 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "fs/TreeWalker.h"
+
+#include "platform/linux/Openat2.h"
+
+#include <cerrno>
+#include <dirent.h>
+#include <fcntl.h>
+
+namespace zor::fs {
+
+using platform::FileDescriptor;
+
+namespace {
+
+constexpr int directoryFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW;
+/// How often a name may change between directory and something else under our hands before it counts as unreadable.
+constexpr int changesMax = 16;
+
+WalkEntryKind kindOf(mode_t mode) {
+    if (S_ISREG(mode))
+        return WalkEntryKind::file;
+    return S_ISLNK(mode) ? WalkEntryKind::symbolicLink : WalkEntryKind::other;
+}
+
+} // namespace
+
+std::string WalkEntry::path() const {
+    if (depth == 0)
+        return {};
+    // At its end a directory is still the stack's deepest level.
+    if (depth < stack->depth())
+        return stack->path();
+    return stack->path().empty() ? std::string(name) : stack->path() + '/' + name;
+}
+
+int TreeWalker::walk(int parent, const char* name, const Visitor& visitor) {
+    stack_.clear();
+    visitor_ = &visitor;
+    rootParent_ = parent;
+    rootName_ = name;
+    rootError_ = 0;
+    vanishedDirectories_ = 0;
+    WalkStep step = visitRoot();
+    while (step != WalkStep::stop && !stack_.empty()) {
+        if (const BulkDirectoryRead::Entry* entry = stack_.reader().next())
+            step = visitName({.parent = stack_.top(),
+                              .name = entry->name,
+                              .status = {.st_ino = entry->inode, .st_mode = static_cast<mode_t>(DTTOIF(entry->type))},
+                              .depth = stack_.depth(),
+                              .index = stack_.nextIndex(),
+                              .stack = &stack_},
+                             entry->type);
+        else
+            step = finishDirectory();
+    }
+    stack_.clear();
+    return step == WalkStep::stop ? -ECANCELED : -rootError_;
+}
+
+WalkStep TreeWalker::visitRoot() {
+    WalkEntry entry{.parent = rootParent_, .name = rootName_.c_str(), .stack = &stack_};
+    // The root may be a mount point itself: its file system is the walk's, whichever that is.
+    if (::fstatat(rootParent_, entry.name, &entry.status, AT_SYMLINK_NOFOLLOW) != 0) {
+        rootError_ = errno;
+        return WalkStep::proceed;
+    }
+    device_ = entry.status.st_dev;
+    return visitName(entry, S_ISDIR(entry.status.st_mode) ? DT_DIR : DT_UNKNOWN);
+}
+
+WalkStep TreeWalker::visitName(WalkEntry entry, unsigned char type) {
+    for (int change = 0;; ++change) {
+        if (type != DT_DIR) {
+            if (type == DT_UNKNOWN || statusWanted_ == WalkStatus::full) {
+                if (::fstatat(entry.parent, entry.name, &entry.status, AT_SYMLINK_NOFOLLOW) != 0) {
+                    entry.error = errno;
+                    if (entry.depth == 0)
+                        rootError_ = entry.error;
+                    else if (entry.error != ENOENT)
+                        return (*visitor_)(entry);
+                    return WalkStep::proceed;
+                }
+            }
+            if (!S_ISDIR(entry.status.st_mode))
+                return visitNonDirectory(entry);
+        }
+        auto directory = atRoot() ? platform::openBeneath(entry.parent, entry.name, directoryFlags)
+                                  : platform::openBeneathOnMount(entry.parent, entry.name, directoryFlags);
+        if (directory)
+            return visitDirectory(entry, std::move(*directory));
+        const int error = directory.error();
+        if ((error != ENOTDIR && error != ELOOP && error != ENOENT) || change == changesMax)
+            return visitUnopened(entry, error);
+        if (error == ENOENT && entry.depth > 0)
+            return WalkStep::proceed;
+        type = DT_UNKNOWN;
+    }
+}
+
+WalkStep TreeWalker::visitNonDirectory(WalkEntry& entry) {
+    entry.kind = kindOf(entry.status.st_mode);
+    // A mount on a file shows only in a status that was asked for.
+    entry.onOtherFileSystem = statusWanted_ == WalkStatus::full && entry.status.st_dev != device_;
+    return (*visitor_)(entry);
+}
+
+WalkStep TreeWalker::visitDirectory(WalkEntry& entry, FileDescriptor directory) {
+    if (::fstat(directory.get(), &entry.status) != 0)
+        return visitUnopened(entry, errno);
+    if (atRoot())
+        device_ = entry.status.st_dev;
+    if (entry.status.st_dev != device_)
+        return visitMountPoint(entry);
+    entry.kind = WalkEntryKind::directory;
+    entry.directory = directory.get();
+    const WalkStep step = (*visitor_)(entry);
+    if (step == WalkStep::skip) {
+        entry.kind = WalkEntryKind::directoryEnd;
+        return (*visitor_)(entry);
+    }
+    if (step != WalkStep::stop)
+        stack_.push(std::move(directory), device_, entry.status.st_ino, entry.name);
+    return step;
+}
+
+WalkStep TreeWalker::visitMountPoint(WalkEntry& entry) {
+    entry.status = {};
+    entry.status.st_mode = S_IFDIR;
+    entry.onOtherFileSystem = true;
+    entry.kind = WalkEntryKind::directory;
+    if (const WalkStep step = (*visitor_)(entry); step == WalkStep::stop)
+        return step;
+    entry.kind = WalkEntryKind::directoryEnd;
+    return (*visitor_)(entry);
+}
+
+WalkStep TreeWalker::visitUnopened(WalkEntry& entry, int error) {
+    if (error == EXDEV)
+        return visitMountPoint(entry);
+    if (statusWanted_ == WalkStatus::full &&
+        ::fstatat(entry.parent, entry.name, &entry.status, AT_SYMLINK_NOFOLLOW) != 0 && errno == ENOENT)
+        return WalkStep::proceed;
+    entry.kind = WalkEntryKind::directory;
+    if (const WalkStep step = (*visitor_)(entry); step == WalkStep::stop)
+        return step;
+    entry.kind = WalkEntryKind::unreadableDirectory;
+    entry.error = error;
+    return (*visitor_)(entry);
+}
+
+WalkStep TreeWalker::finishDirectory() {
+    std::size_t levelsLost = 0;
+    if (!stack_.ensureParent(levelsLost)) {
+        vanishedDirectories_ += levelsLost;
+        return WalkStep::proceed;
+    }
+    const bool isRoot = stack_.depth() == 1;
+    const std::string name = isRoot ? rootName_ : stack_.name();
+    WalkEntry entry{.kind = WalkEntryKind::directoryEnd,
+                    .parent = isRoot ? rootParent_ : stack_.parent(),
+                    .name = name.c_str(),
+                    .directory = stack_.top(),
+                    .error = stack_.reader().error(),
+                    .depth = stack_.depth() - 1,
+                    .pass = stack_.pass(),
+                    .stack = &stack_};
+    entry.status.st_mode = S_IFDIR;
+    if (statusWanted_ == WalkStatus::full && ::fstat(entry.directory, &entry.status) != 0)
+        entry.error = errno;
+    if (entry.error != 0)
+        entry.kind = WalkEntryKind::unreadableDirectory;
+    const WalkStep step = (*visitor_)(entry);
+    if (step == WalkStep::again && entry.kind == WalkEntryKind::directoryEnd)
+        stack_.rewind();
+    else if (step != WalkStep::stop)
+        stack_.pop();
+    return step;
+}
+
+} // namespace zor::fs
