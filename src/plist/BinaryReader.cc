@@ -22,6 +22,9 @@ using Bytes = std::span<const std::uint8_t>;
 
 /// `width` is 1 to 8 and the bytes are there.
 std::uint64_t bigEndian(const std::uint8_t* at, std::size_t width) {
+    // Small property lists, the usual ones, have offsets and references of one byte.
+    if (width == 1)
+        return *at;
     std::uint64_t number = 0;
     for (std::size_t i = 0; i < width; ++i)
         number = (number << 8) | at[i];

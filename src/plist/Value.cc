@@ -4,14 +4,11 @@
 #include <algorithm>
 #include <cmath>
 #include <limits>
+#include <numeric>
 
 namespace zor::plist {
 
 namespace {
-
-bool keyIsLess(const Dictionary::Entry& left, const Dictionary::Entry& right) {
-    return left.first < right.first;
-}
 
 /// A number that is none equals itself here: what was stored compares equal to what was asked to be stored.
 bool sameNumber(double left, double right) {
@@ -31,22 +28,25 @@ Dictionary::Dictionary() = default;
 Dictionary::Dictionary(std::initializer_list<Entry> entries) : Dictionary(fromUnsorted(std::vector<Entry>(entries))) {}
 
 Dictionary Dictionary::fromUnsorted(std::vector<Entry> entries) {
-    const auto notAscending = [](const Entry& left, const Entry& right) { return !keyIsLess(left, right); };
-    if (std::adjacent_find(entries.begin(), entries.end(), notAscending) != entries.end()) {
-        std::stable_sort(entries.begin(), entries.end(), keyIsLess);
-        // Of a run of equal keys only the last stays.
-        std::size_t kept = 0;
-        for (std::size_t at = 0; at < entries.size(); ++at) {
-            if (at + 1 < entries.size() && entries[at].first == entries[at + 1].first)
-                continue;
-            if (kept != at)
-                entries[kept] = std::move(entries[at]);
-            ++kept;
-        }
-        entries.resize(kept);
-    }
     Dictionary result;
-    result.entries_ = std::move(entries);
+    const auto notAscending = [](const Entry& left, const Entry& right) { return left.first >= right.first; };
+    // What the writer wrote comes back sorted.
+    if (std::adjacent_find(entries.begin(), entries.end(), notAscending) == entries.end()) {
+        result.entries_ = std::move(entries);
+        return result;
+    }
+    std::vector<std::size_t> order(entries.size());
+    std::iota(order.begin(), order.end(), std::size_t{0});
+    std::sort(order.begin(), order.end(), [&entries](std::size_t left, std::size_t right) {
+        const int compared = entries[left].first.compare(entries[right].first);
+        return compared != 0 ? compared < 0 : left < right;
+    });
+    result.entries_.reserve(entries.size());
+    for (std::size_t at = 0; at < order.size(); ++at) {
+        // Of a run of equal keys only the last stays.
+        if (at + 1 == order.size() || entries[order[at]].first != entries[order[at + 1]].first)
+            result.entries_.push_back(std::move(entries[order[at]]));
+    }
     return result;
 }
 
