@@ -7,7 +7,9 @@
 
 #include <cerrno>
 #include <fcntl.h>
+#include <string_view>
 #include <sys/random.h>
+#include <vector>
 
 namespace zor::fs {
 
@@ -26,7 +28,8 @@ void removeLeftovers(platform::Disk& disk, int directory, const std::string& pre
     if (!listing)
         return;
     std::vector<std::string> leftovers;
-    BulkDirectoryRead entries(listing->get());
+    BulkDirectoryRead::Buffer buffer;
+    BulkDirectoryRead entries(listing->get(), buffer);
     while (const auto* entry = entries.next())
         if (std::string_view(entry->name).starts_with(prefix))
             leftovers.emplace_back(entry->name);

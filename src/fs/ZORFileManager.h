@@ -71,6 +71,8 @@ public:
     Result<void> standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid);
     /// The entries whose names do not begin with ".", in the directory's order.
     Result<std::vector<FileURL>> urlsForItemsInDirectoryAtURL(const FileURL& directory);
+    /// What copies across file systems that were cut short left in a directory. Empty when it cannot be read.
+    std::vector<FileURL> copyLeftoversInDirectoryAtURL(const FileURL& directory);
     /// To the log, one line an entry.
     void printDirectoryStructureAtURL(const FileURL& url);
     /// Allocated bytes of everything below that is no directory, hard links once.

@@ -1,6 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
-// Every name that the store has on disk, spelled here and nowhere else.
+// Every name that the store has on disk, spelled here (and, for the one that the file manager knows
+// too, in the header below) and nowhere else.
 #pragma once
+
+#include "fs/MetadataFileName.h"
 
 #include <array>
 #include <string_view>
@@ -27,9 +30,6 @@ inline constexpr std::string_view staging = "Staging";
 inline constexpr std::string_view deathrow = "Dead";
 inline constexpr std::string_view replace = "Replace";
 inline constexpr std::string_view bundle = "Bundle";
-
-/// Hidden in every container: whom it belongs to.
-inline constexpr const char* metadataFile = ".com.veltra.zorvane.metadata.plist";
 
 /// In the library directory: what each identifier is entitled to.
 inline constexpr const char* entitlementFile = "zor_entitlements.plist";

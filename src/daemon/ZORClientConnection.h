@@ -1,0 +1,117 @@
+// SPDX-License-Identifier: Apache-2.0
+// The client of one message, and the container operations made in its name.
+//
+// One object a message, always held by a shared_ptr; the daemon's own (identifier "com.veltra.zorvaned.internal") lives as long as the daemon. Operations
+// may be called from any thread; which locks they take and when is said at each. Errors are logged where they are made, and
+// every operation a command calls ends exceptions at its boundary (code 40). Nothing is deleted in place: what goes away moves to
+// death row, and the death-row queue removes it later.
+//
+// The operations are written in src/store/operations/, a source for each family.
+#pragma once
+
+#include "daemon/base/ContainerClass.h"
+#include "daemon/base/FileURL.h"
+#include "daemon/base/Result.h"
+#include "daemon/base/UUID.h"
+#include "daemon/base/ZORLocks.h"
+#include "store/ZORMetadata.h"
+
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace zor {
+
+struct StoreServices;
+
+enum class UseLocking { no, yes };
+enum class StartDeletionThread { no, yes };
+
+/// A container as an operation found or made it. What a reply needs of the record was read while the operation still held its
+/// lock, so one client never sees what another's request made of the shared record meanwhile.
+struct FoundContainer {
+    std::shared_ptr<ZORMetadata> record;
+    UUID uuid;
+    std::string path;
+    bool existed = false;
+};
+
+class ZORClientConnection : public std::enable_shared_from_this<ZORClientConnection> {
+public:
+    /// initWithBundleId:clientUserId:allowOtherIdLookup:entitledWipeIdentifiers:
+    struct Client {
+        std::optional<std::string> bundleIdentifier;
+        std::uint32_t userId = 0;
+        bool allowOtherIdLookup = false;
+        std::optional<std::vector<std::string>> entitledWipeIdentifiers;
+    };
+    ZORClientConnection(StoreServices& services, Client client) : services_(services), client_(std::move(client)) {}
+    ZORClientConnection(const ZORClientConnection&) = delete;
+    ZORClientConnection& operator=(const ZORClientConnection&) = delete;
+
+    [[nodiscard]] const std::optional<std::string>& clientBundleIdentifier() const { return client_.bundleIdentifier; }
+    [[nodiscard]] std::uint32_t clientUserId() const { return client_.userId; }
+    [[nodiscard]] bool allowOtherIdLookup() const { return client_.allowOtherIdLookup; }
+
+    // Creation and lookup (CreateOrLookup.cc).
+    struct CreateOrLookupOptions {
+        bool createIfNecessary = false;
+        bool transient = false;
+        UseLocking useLocking = UseLocking::yes;
+    };
+    /// The container of (user, identifier, class), created if asked. With locking it runs under the all-identifiers lock
+    /// held for writing. `identifier` nullptr: error 11.
+    Result<FoundContainer> createOrLookupContainerForUser(std::uint32_t userId, const std::string* identifier,
+                                                          ContainerClass containerClass,
+                                                          const CreateOrLookupOptions& options);
+
+    // Listing (Listing.cc).
+    struct ListedContainer {
+        std::string identifier;
+        UUID uuid;
+    };
+    /// Under the all-identifiers lock held for reading.
+    Result<std::vector<ListedContainer>> containersForUser(std::uint32_t userId, ContainerClass containerClass,
+                                                           bool transient);
+
+    // Death row (DeathRow.cc).
+    /// Moves an item away; a missing one is no failure. Error 41.
+    Result<void> _moveItemAtURLToDeathRow(const FileURL& url, StartDeletionThread startDeletionThread);
+    /// Queues one deletion pass; the completion runs on the death-row queue with success or the pass's last error code.
+    void deleteContainersOnDeathRowWithCompletion(std::function<void(ErrorCode)> completion);
+    /// Removes an item, or moves it to the system's directory for temporary files. Error 4.
+    Result<void> _removeItemOrMoveToTempAtURL(const FileURL& url);
+
+    // Setup (Setup.cc): before clients are served, on the thread that starts the daemon, without identifier locks.
+    void rebootContainerManagerSetup();
+    void containerManagerSetup();
+    void _cleanupOrphanedDataForUser(std::uint32_t userId, ContainerClass containerClass);
+
+    // Sandbox mapping (SandboxMapping.cc).
+    /// Removes the mapping, then sets it when there is a URL. False, logged, on failure.
+    bool _setSandboxContainerMappingForUser(std::uint32_t userId, const std::string& identifier,
+                                            ContainerClass containerClass, const std::optional<FileURL>& url);
+
+private:
+    Result<FoundContainer> createOrLookup(std::uint32_t userId, const std::string& identifier,
+                                          ContainerClass containerClass, const CreateOrLookupOptions& options);
+    Result<void> discardTransient(const ZORMetadata& record, const std::string& identifier);
+    Result<FoundContainer> create(std::uint32_t userId, const std::string& identifier, ContainerClass containerClass,
+                                  bool transient);
+    Result<void> checkRequest(std::uint32_t userId, const std::string* identifier, ContainerClass containerClass);
+    ZORError cleanUpStaging(const FileURL& staging, ZORError error);
+    Result<void> makeDurable(const FoundContainer& container);
+
+    void runDeletionPass(const std::function<void(ErrorCode)>& completion);
+    std::optional<ZORError> deleteEverythingOnDeathRow();
+    bool isOrphan(const FileURL& entry, ContainerClass containerClass);
+    void reportOrphan(const FileURL& entry);
+    void sweepStaging();
+
+    StoreServices& services_;
+    Client client_;
+};
+
+} // namespace zor

@@ -1,0 +1,214 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "entitlements/ZOREntitlementMapping.h"
+
+#include "fs/DictionaryFile.h"
+#include "store/Names.h"
+
+#include <algorithm>
+#include <cerrno>
+
+namespace zor {
+
+using platform::MutexLock;
+
+namespace {
+
+/// Far above any device's map (a thousand identifiers take about a megabyte), far below what reading could not bear.
+constexpr std::size_t mappingFileBytesMax = std::size_t{64} << 20;
+constexpr std::string_view systemGroupPrefix = "systemgroup.";
+
+} // namespace
+
+ZOREntitlementMapping::ZOREntitlementMapping(const Log& log, ZORFileManager& fileManager,
+                                             ZORGlobalConfiguration& configuration)
+    : log_(log), fileManager_(fileManager), configuration_(configuration),
+      entitlementMappingFileUrl_(configuration.libraryDirectory().appendingFile(names::entitlementFile)),
+      entitlementMappingDict_(_readEntitlementMappingFromDisk()) {}
+
+plist::Dictionary ZOREntitlementMapping::_readEntitlementMappingFromDisk() {
+    auto map = readDictionaryAtURL(entitlementMappingFileUrl_, mappingFileBytesMax, fileManager_);
+    if (map)
+        return std::move(*map);
+    log_.write(logLevelError, __func__, "Failed to read entitlement mapping file at %s.  It may not exist yet",
+               entitlementMappingFileUrl_.c_str());
+    if (!map.error().isPosix(ENOENT)) {
+        log_.write(logLevelError, __func__, "%s", map.error().text().c_str());
+        moveUnreadableFileAside();
+    }
+    return {};
+}
+
+void ZOREntitlementMapping::moveUnreadableFileAside() {
+    const FileURL aside =
+        entitlementMappingFileUrl_.deletingLastPathComponent().appendingFile(names::unreadableEntitlementFile);
+    // An earlier loss that nobody has looked at is not written over.
+    if (fileManager_.itemExistsAtURL(aside)) {
+        log_.write(logLevelError, __func__, "%s lies there already; the unreadable file is left where it is",
+                   aside.c_str());
+        return;
+    }
+    const auto moved = fileManager_.moveItemAtURL(entitlementMappingFileUrl_, aside);
+    if (moved)
+        log_.write(logLevelError, __func__,
+                   "Moved it to %s. Until that file is removed, nothing is deleted for want of an entitlement",
+                   aside.c_str());
+    else
+        log_.write(logLevelError, __func__, "%s", moved.error().text().c_str());
+}
+
+std::optional<FileURL> ZOREntitlementMapping::lostFile() {
+    FileURL aside =
+        entitlementMappingFileUrl_.deletingLastPathComponent().appendingFile(names::unreadableEntitlementFile);
+    if (fileManager_.itemDoesNotExistAtURL(aside))
+        return std::nullopt;
+    return aside;
+}
+
+Result<void> ZOREntitlementMapping::_writeEntitlementMappingToDisk() {
+    configuration_.libraryDirectory(); // makes it again should it have gone
+    const auto written = writeToURL(entitlementMappingDict_, entitlementMappingFileUrl_,
+                                    writeAtomically | writeWithoutProtection, fileManager_);
+    if (!written)
+        return makeError(log_, ZOR_HERE, ErrorCode::entitlementFileNotWritten, &written.error(), LogFlag::yes,
+                         "Failed to write entitlement mapping file at %s", entitlementMappingFileUrl_.c_str());
+    return {};
+}
+
+Result<void> ZOREntitlementMapping::_setEntitlementDictionaryValues(const std::vector<plist::Dictionary>& values,
+                                                                    const std::vector<std::string>& identifiers) {
+    if (values.size() != identifiers.size())
+        return makeError(log_, ZOR_HERE, ErrorCode::entitlementCountsDiffer, nullptr, LogFlag::yes,
+                         "Can't act on an invalid input: values count: %ld, IDs count: %ld",
+                         static_cast<long>(values.size()), static_cast<long>(identifiers.size()));
+    const MutexLock held(entitlementQueue_);
+    bool changed = false;
+    for (std::size_t i = 0; i < values.size(); ++i) {
+        const bool hasValue = !values[i].empty();
+        const plist::Value* current = entitlementMappingDict_.find(identifiers[i]);
+        const plist::Dictionary* currentDictionary = current ? current->asDictionary() : nullptr;
+        const bool unchanged = hasValue ? currentDictionary && *currentDictionary == values[i] : !current;
+        if (unchanged)
+            continue;
+        if (hasValue)
+            entitlementMappingDict_.set(identifiers[i], values[i]);
+        else
+            entitlementMappingDict_.erase(identifiers[i]);
+        if (log_.writes(logLevelDebug)) {
+            const plist::Value shown(values[i]);
+            log_.write(logLevelDebug, __func__, "Staging Entitlement Mapping for ID: %s : %s",
+                       ZOR_SHOWN(identifiers[i]), plist::describe(hasValue ? &shown : nullptr).c_str());
+        }
+        changed = true;
+    }
+    if (!changed)
+        return {};
+    auto written = _writeEntitlementMappingToDisk();
+    if (!written)
+        log_.write(logLevelError, __func__, "Error writing entitlement mappings to disk after set : %s",
+                   written.error().text().c_str());
+    else
+        ZOR_LOG(log_, logLevelDebug, "Wrote entitlement mappings to disk after set");
+    return written;
+}
+
+ZOREntitlementMapping::Identifiers ZOREntitlementMapping::_copyApplicationGroupEntitlementForIdentifier(
+    std::string_view identifier, const plist::Dictionary* entitlements, std::string_view groupKey) const {
+    const plist::Value* value = entitlements ? entitlements->find(groupKey) : nullptr;
+    if (!value)
+        return std::nullopt;
+    if (const std::string* one = value->asString())
+        return std::vector<std::string>{*one};
+    const std::string key(groupKey);
+    const std::string whose(identifier);
+    const plist::Array* array = value->asArray();
+    if (!array) {
+        log_.write(logLevelError, __func__, "Entitlement %s for %s does not contain supported types; ignoring.",
+                   key.c_str(), ZOR_SHOWN(whose));
+        return std::nullopt;
+    }
+    std::vector<std::string> identifiers;
+    for (const plist::Value& element : *array) {
+        const std::string* group = element.asString();
+        if (!group) {
+            log_.write(logLevelError, __func__, "Entitlement %s for %s contains non-string values; ignoring.",
+                       key.c_str(), ZOR_SHOWN(whose));
+            return std::nullopt;
+        }
+        identifiers.push_back(*group);
+    }
+    std::ranges::sort(identifiers);
+    identifiers.erase(std::ranges::unique(identifiers).begin(), identifiers.end());
+    return identifiers;
+}
+
+const plist::Dictionary* ZOREntitlementMapping::entitlementsOf(std::string_view identifier) const {
+    return entitlementMappingDict_.dictionary(identifier);
+}
+
+bool ZOREntitlementMapping::_onQueue_identifierHasCallerRegisteredEntitlements(std::string_view identifier) const {
+    const plist::Dictionary* flags = entitlementMappingDict_.dictionary(entitlementMapKeys::registeredByCaller);
+    return flags && flags->isTrue(identifier);
+}
+
+bool ZOREntitlementMapping::_onQueue_identifierHasSystemContainer(std::string_view identifier) const {
+    const plist::Dictionary* entitlements = entitlementsOf(identifier);
+    return entitlements && entitlements->isTrue(entitlementKeys::systemContainer);
+}
+
+ZOREntitlementMapping::Identifiers
+ZOREntitlementMapping::_onQueue_appGroupIdentifiersForIdentifier(std::string_view identifier) const {
+    return _copyApplicationGroupEntitlementForIdentifier(identifier, entitlementsOf(identifier),
+                                                         entitlementKeys::applicationGroups);
+}
+
+ZOREntitlementMapping::Identifiers
+ZOREntitlementMapping::_onQueue_systemGroupIdentifiersForIdentifier(std::string_view identifier) const {
+    const plist::Dictionary* entitlements = entitlementsOf(identifier);
+    Identifiers groups =
+        _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, entitlementKeys::systemGroups);
+    if (!groups || groups->empty())
+        groups = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements,
+                                                               entitlementKeys::systemGroupContainers);
+    if (groups)
+        std::erase_if(*groups, [&](const std::string& group) {
+            if (group.starts_with(systemGroupPrefix))
+                return false;
+            log_.write(logLevelError, "_onQueue_systemGroupIdentifiersForIdentifier",
+                       "System group ID %s does not have proper prefix, ignoring.", ZOR_SHOWN(group));
+            return true;
+        });
+    return groups;
+}
+
+bool ZOREntitlementMapping::entitlementsExistForIdentifier(std::string_view identifier) {
+    const MutexLock held(entitlementQueue_);
+    return entitlementMappingDict_.find(identifier) != nullptr;
+}
+
+bool ZOREntitlementMapping::identifierHasCallerRegisteredEntitlements(std::string_view identifier) {
+    const MutexLock held(entitlementQueue_);
+    return _onQueue_identifierHasCallerRegisteredEntitlements(identifier);
+}
+
+bool ZOREntitlementMapping::identifierHasSystemContainer(std::string_view identifier) {
+    const MutexLock held(entitlementQueue_);
+    return _onQueue_identifierHasSystemContainer(identifier);
+}
+
+ZOREntitlementMapping::Identifiers ZOREntitlementMapping::appGroupIdentifiersForIdentifier(std::string_view identifier) {
+    const MutexLock held(entitlementQueue_);
+    return _onQueue_appGroupIdentifiersForIdentifier(identifier);
+}
+
+ZOREntitlementMapping::Identifiers
+ZOREntitlementMapping::systemGroupIdentifiersForIdentifier(std::string_view identifier) {
+    const MutexLock held(entitlementQueue_);
+    return _onQueue_systemGroupIdentifiersForIdentifier(identifier);
+}
+
+std::size_t ZOREntitlementMapping::entryCount() {
+    const MutexLock held(entitlementQueue_);
+    return entitlementMappingDict_.size();
+}
+
+} // namespace zor

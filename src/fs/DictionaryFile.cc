@@ -1,0 +1,64 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "fs/DictionaryFile.h"
+
+#include "fs/AtomicFile.h"
+#include "fs/OwnedFile.h"
+#include "platform/linux/Openat2.h"
+#include "plist/Binary.h"
+#include "plist/Read.h"
+
+#include <cerrno>
+#include <cstring>
+#include <fcntl.h>
+
+namespace zor {
+
+Result<void> writeToURL(const plist::Dictionary& dictionary, const FileURL& url, std::uint32_t options,
+                        ZORFileManager& fileManager) {
+    if (options != (writeAtomically | writeWithoutProtection))
+        return posixError(ZOR_HERE, EINVAL, "write of %s failed: options 0x%x are not offered", url.c_str(), options);
+    const auto bytes = plist::writeBinary(dictionary);
+    if (!bytes)
+        return posixError(ZOR_HERE, EINVAL, "serialisation for %s failed: %s", url.c_str(),
+                          bytes.error().reason);
+    const auto parent = fileManager.resolver().openParent(url);
+    const int status = parent ? fs::replaceFileDurably(fileManager.disk(), parent->directory.get(), parent->name, 0644,
+                                                       *bytes)
+                              : -parent.error();
+    if (status < 0)
+        return posixError(ZOR_HERE, -status, "write of %s failed: %s", url.c_str(), errorText(-status));
+    return {};
+}
+
+Result<plist::Dictionary> readDictionaryAtURL(const FileURL& url, std::size_t bytesMax, ZORFileManager& fileManager) {
+    const auto parent = fileManager.resolver().openParent(url);
+    const auto bytes = parent ? fs::readOwnedFile(parent->directory.get(), parent->name.c_str(), bytesMax)
+                              : std::unexpected(parent.error());
+    if (!bytes)
+        return posixError(ZOR_HERE, bytes.error(), "read of %s failed: %s", url.c_str(), errorText(bytes.error()));
+    auto value = plist::readPropertyList(*bytes);
+    if (!value)
+        return posixError(ZOR_HERE, EINVAL, "read of %s failed: %s", url.c_str(), value.error().text().c_str());
+    plist::Dictionary* dictionary = value->asMutableDictionary();
+    if (!dictionary)
+        return posixError(ZOR_HERE, EINVAL, "read of %s failed: it is no dictionary", url.c_str());
+    return std::move(*dictionary);
+}
+
+std::string stringWithFileSystemRepresentation(const char* bytes, std::size_t length) { return {bytes, length}; }
+
+std::string stringWithFileSystemRepresentation(const char* bytes) { return {bytes, std::strlen(bytes)}; }
+
+bool containsDotDotPathComponents(std::string_view path) {
+    while (!path.empty()) {
+        const auto slash = path.find('/');
+        if (path.substr(0, slash) == "..")
+            return true;
+        if (slash == std::string_view::npos)
+            break;
+        path.remove_prefix(slash + 1);
+    }
+    return false;
+}
+
+} // namespace zor

@@ -1,0 +1,309 @@
+// SPDX-License-Identifier: Apache-2.0
+// The file manager's work on whole trees: removing, copying, moving, walking, listing, measuring.
+#include "fs/AtomicFile.h"
+#include "fs/BulkDirectoryRead.h"
+#include "fs/DiskUsage.h"
+#include "fs/RecursiveCopy.h"
+#include "fs/RecursiveRemove.h"
+#include "fs/ZORFileManager.h"
+#include "platform/linux/Openat2.h"
+#include "fs/MetadataFileName.h"
+
+#include <cerrno>
+#include <dirent.h>
+#include <fcntl.h>
+#include <sys/stat.h>
+
+namespace zor {
+
+using fs::WalkEntry;
+using fs::WalkEntryKind;
+using fs::WalkStep;
+
+namespace {
+
+constexpr const char* copyPrefix = ".zorvaned-copy-";
+
+std::string below(const FileURL& root, const std::string& relative) {
+    return relative.empty() ? root.path() : root.path() + "/" + relative;
+}
+
+/// 0755 for directories and whatever somebody may execute, else 0644.
+mode_t standardMode(mode_t mode) { return S_ISDIR(mode) || (mode & 0111) ? 0755 : 0644; }
+
+} // namespace
+
+Result<void> ZORFileManager::removeItemAtURL(const std::optional<FileURL>& url) {
+    if (!url)
+        return posixError(ZOR_HERE, EFAULT, "nil url passed to -removeItemAtURL:error:");
+    const auto parent = resolver_.openParent(*url);
+    if (!parent && parent.error() == ENOENT)
+        return {};
+    if (!parent)
+        return posixError(ZOR_HERE, parent.error(), "prunetree of %s failed: %s", url->c_str(),
+                          errorText(parent.error()));
+    int firstError = 0;
+    constexpr const char* function = "removeItemAtURL";
+    fs::RemoveCallbacks callbacks;
+    callbacks.directoryMadeMutable = [&](const std::string& path) {
+        log_.write(logLevelNotice, function, "Unset UF_IMMUTABLE on %s", ZOR_SHOWN(below(*url, path)));
+    };
+    callbacks.failed = [&](const fs::RemoveFailure& failure) {
+        const std::string path = below(*url, failure.path);
+        if (failure.error != ENOENT)
+            log_.write(logLevelError, function, "prunetree hit error for %s : %s", ZOR_SHOWN(path),
+                       errorText(failure.error));
+        if (failure.error == EPERM) {
+            const int cleared = fs::clearImmutable(disk_, failure.parent, failure.name);
+            if (cleared < 0)
+                log_.write(logLevelError, function, "Failed to lchflags %s: %s", ZOR_SHOWN(path), errorText(-cleared));
+            if (cleared == 1) {
+                log_.write(logLevelNotice, function, "Unset UF_IMMUTABLE on %s", ZOR_SHOWN(path));
+                const int removed = disk_.unlinkFile(failure.parent, failure.name);
+                if (removed == 0)
+                    return fs::RemoveAnswer::proceed;
+                log_.write(logLevelError, function, "unlink of %s failed: %s", ZOR_SHOWN(path), errorText(-removed));
+            }
+        }
+        if (firstError == 0)
+            firstError = failure.error;
+        return fs::RemoveAnswer::proceed;
+    };
+    const int status = fs::removeTree(disk_, parent->directory.get(), parent->name.c_str(), callbacks);
+    const int number = status < 0 && status != -ENOENT ? -status : firstError;
+    if (number == 0 || number == ENOENT)
+        return {};
+    return posixError(ZOR_HERE, number, "prunetree of %s failed: %s", url->c_str(), errorText(number));
+}
+
+Result<void> ZORFileManager::copyItemAtURL(const FileURL& source, const FileURL& destination) {
+    return _copyItemAtURL(source, destination, MissingSource::fails);
+}
+
+Result<void> ZORFileManager::copyItemIfExistsAtURL(const FileURL& source, const FileURL& destination) {
+    return _copyItemAtURL(source, destination, MissingSource::isFine);
+}
+
+Result<void> ZORFileManager::moveItemAtURL(const FileURL& source, const FileURL& destination) {
+    return _moveItemAtURL(source, destination, MissingSource::fails);
+}
+
+Result<void> ZORFileManager::moveItemIfExistsAtURL(const FileURL& source, const FileURL& destination) {
+    return _moveItemAtURL(source, destination, MissingSource::isFine);
+}
+
+Result<bool> ZORFileManager::sourceIsMissing(const FileURL& source) {
+    struct stat status {};
+    const int failure = resolver_.status(source, status);
+    if (failure != 0 && failure != ENOENT)
+        return posixError(ZOR_HERE, failure, "stat of %s failed: %s", source.c_str(), errorText(failure));
+    return failure == ENOENT;
+}
+
+Result<void> ZORFileManager::_copyItemAtURL(const FileURL& source, const FileURL& destination, MissingSource missing) {
+    if (missing == MissingSource::isFine && TRY(sourceIsMissing(source)))
+        return {};
+    return copyTree(source, destination);
+}
+
+Result<void> ZORFileManager::copyTree(const FileURL& source, const FileURL& destination) {
+    const auto from = resolver_.openParent(source);
+    const auto to = resolver_.openParent(destination);
+    int status = 0;
+    if (!from || !to) {
+        status = -(from ? to.error() : from.error());
+    } else {
+        const std::string hidden = fs::uniqueName(copyPrefix);
+        const int directory = to->directory.get();
+        status = fs::copyTree(disk_, from->directory.get(), from->name.c_str(), directory, hidden.c_str());
+        // Nothing of a copy may be missing once it has its name, whatever the power does.
+        if (status == 0)
+            if (const auto copied = platform::openBeneath(directory, ".", O_RDONLY | O_DIRECTORY))
+                status = disk_.syncFileSystem(copied->get());
+        if (status == 0)
+            status = disk_.rename(directory, hidden.c_str(), directory, to->name.c_str(), 0);
+        if (status < 0)
+            fs::removeTree(disk_, directory, hidden.c_str());
+    }
+    if (status < 0)
+        return posixError(ZOR_HERE, -status, "clonetree of %s to %s failed: %s", source.c_str(), destination.c_str(),
+                          errorText(-status));
+    return {};
+}
+
+Result<void> ZORFileManager::_moveItemAtURL(const FileURL& source, const FileURL& destination, MissingSource missing) {
+    if (missing == MissingSource::isFine && TRY(sourceIsMissing(source)))
+        return {};
+    const auto from = resolver_.openParent(source);
+    const auto to = resolver_.openParent(destination);
+    const int status = !from ? -from.error()
+                       : !to ? -to.error()
+                             : disk_.rename(from->directory.get(), from->name.c_str(), to->directory.get(),
+                                            to->name.c_str(), 0);
+    if (status == -EXDEV && from && to)
+        return moveAcrossFileSystems(source, destination);
+    if (status < 0)
+        return posixError(ZOR_HERE, -status, "rename of %s to %s failed: %s", source.c_str(), destination.c_str(),
+                          errorText(-status));
+    return {};
+}
+
+Result<void> ZORFileManager::moveAcrossFileSystems(const FileURL& source, const FileURL& destination) {
+    TRY(copyTree(source, destination));
+    const auto from = resolver_.openParent(source);
+    const int removed = from ? fs::removeTree(disk_, from->directory.get(), from->name.c_str()) : -from.error();
+    if (removed < 0)
+        log_.write(logLevelError, __func__, "Failed to remove source %s : %s", source.c_str(), errorText(-removed));
+    return {};
+}
+
+Result<void> ZORFileManager::_traverseDirectory(const FileURL& url,
+                                                const std::function<Result<void>(const WalkEntry&)>& visitor) {
+    const auto parent = resolver_.openParent(url);
+    if (!parent)
+        return posixError(ZOR_HERE, parent.error(), "fts_open failed for %s with error %s", url.c_str(),
+                          errorText(parent.error()));
+    std::optional<ZORError> failure;
+    fs::TreeWalker walker;
+    const int status = walker.walk(parent->directory.get(), parent->name.c_str(), [&](const WalkEntry& entry) {
+        if (entry.kind == WalkEntryKind::noStatus) {
+            failure = posixError({"_traverseDirectory", __LINE__}, entry.error, "Error for path %s: %s", url.c_str(),
+                                 errorText(entry.error));
+            return WalkStep::stop;
+        }
+        if (auto answer = visitor(entry); !answer) {
+            failure = std::move(answer).error();
+            return WalkStep::stop;
+        }
+        return WalkStep::proceed;
+    });
+    if (failure)
+        return *failure;
+    if (status < 0)
+        return posixError(ZOR_HERE, -status, "Error for path %s: %s", url.c_str(), errorText(-status));
+    return {};
+}
+
+void ZORFileManager::standardizeEntry(int parent, const char* name, const std::string& path, uid_t uid, gid_t gid) {
+    constexpr const char* function = "standardizeOwnershipAtURL";
+    const auto item = platform::openBeneath(parent, name, O_PATH | O_NOFOLLOW);
+    struct stat status {};
+    if (!item || ::fstat(item->get(), &status) != 0) {
+        const int number = item ? errno : item.error();
+        if (number != ENOENT)
+            log_.write(logLevelError, function, "Could not chown %s: %s", ZOR_SHOWN(path), errorText(number));
+        return;
+    }
+    // A file with another name elsewhere may belong to somebody else's tree.
+    const bool sharedElsewhere = !S_ISDIR(status.st_mode) && status.st_nlink > 1;
+    if (!sharedElsewhere && (status.st_uid != uid || status.st_gid != gid))
+        if (const int changed = disk_.changeOwner(item->get(), uid, gid); changed < 0)
+            log_.write(logLevelError, function, "Could not chown %s: %s", ZOR_SHOWN(path), errorText(-changed));
+    if (sharedElsewhere || S_ISLNK(status.st_mode)) // Linux keeps no mode for a link
+        return;
+    if (const int changed = disk_.changeMode(item->get(), standardMode(status.st_mode)); changed < 0)
+        log_.write(logLevelError, function, "Could not chmod %s: %s", ZOR_SHOWN(path), errorText(-changed));
+}
+
+Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid) {
+    const bool rootIsMetadata = url.path().find(names::metadataFile) != std::string::npos;
+    const Result<void> walked = _traverseDirectory(url, [&](const WalkEntry& entry) -> Result<void> {
+        const std::string path = below(url, entry.path());
+        if (entry.kind != WalkEntryKind::directoryEnd && !entry.onOtherFileSystem &&
+            path.find(names::metadataFile) == std::string::npos)
+            standardizeEntry(entry.parent, entry.name, path, uid, gid);
+        return {};
+    });
+    const auto parent = resolver_.openParent(url);
+    struct stat status {};
+    const int failure = parent ? resolver_.status(url, status) : parent.error();
+    if (failure != 0)
+        return posixError(ZOR_HERE, failure, "Could not stat %s: %s", url.c_str(), errorText(failure));
+    if (!rootIsMetadata)
+        standardizeEntry(parent->directory.get(), parent->name.c_str(), url.path(), uid, gid);
+    return walked;
+}
+
+Result<std::vector<FileURL>> ZORFileManager::urlsForItemsInDirectoryAtURL(const FileURL& directory) {
+    constexpr const char* label = "_IterateDirectory";
+    const auto failed = [&](int number) {
+        return posixError({"urlsForItemsInDirectoryAtURL", __LINE__}, number, "_IterateDirectory for %s returned %s",
+                          directory.c_str(), errorText(number));
+    };
+    const auto opened = resolver_.openDirectory(directory);
+    if (!opened) {
+        if (opened.error() != ENOENT)
+            log_.write(logLevelError, label, "opendir of %s failed: %s", directory.c_str(), errorText(opened.error()));
+        return failed(opened.error());
+    }
+    std::vector<FileURL> urls;
+    fs::BulkDirectoryRead::Buffer buffer;
+    fs::BulkDirectoryRead entries(opened->get(), buffer);
+    while (const auto* entry = entries.next()) {
+        if (entry->name[0] == '.')
+            continue;
+        unsigned char type = entry->type;
+        struct stat status {};
+        if (type == DT_UNKNOWN && ::fstatat(opened->get(), entry->name, &status, AT_SYMLINK_NOFOLLOW) == 0)
+            type = static_cast<unsigned char>(IFTODT(status.st_mode));
+        urls.push_back(type == DT_DIR ? directory.appendingDirectory(entry->name)
+                                      : directory.appendingFile(entry->name));
+    }
+    if (entries.error() != 0)
+        return failed(entries.error());
+    return urls;
+}
+
+std::vector<FileURL> ZORFileManager::copyLeftoversInDirectoryAtURL(const FileURL& directory) {
+    std::vector<FileURL> leftovers;
+    const auto opened = resolver_.openDirectory(directory);
+    if (!opened)
+        return leftovers;
+    fs::BulkDirectoryRead::Buffer buffer;
+    fs::BulkDirectoryRead entries(opened->get(), buffer);
+    while (const auto* entry = entries.next())
+        if (std::string_view(entry->name).starts_with(copyPrefix))
+            leftovers.push_back(directory.appendingDirectory(entry->name));
+    return leftovers;
+}
+
+void ZORFileManager::printDirectoryStructureAtURL(const FileURL& url) {
+    const auto parent = resolver_.openParent(url);
+    if (!parent) {
+        log_.write(logLevelError, __func__, "fts_open failed for %s : %s", url.c_str(), errorText(parent.error()));
+        return;
+    }
+    constexpr const char* function = "printDirectoryStructureAtURL";
+    fs::TreeWalker walker(fs::WalkStatus::typeOnly);
+    const int status = walker.walk(parent->directory.get(), parent->name.c_str(), [&](const WalkEntry& entry) {
+        const std::string path = below(url, entry.path());
+        if (entry.kind == WalkEntryKind::unreadableDirectory || entry.kind == WalkEntryKind::noStatus)
+            log_.write(logLevelError, function, "FTS returned error for %s : %s", ZOR_SHOWN(path),
+                       errorText(entry.error));
+        else if (entry.kind != WalkEntryKind::directoryEnd)
+            log_.write(logLevelError, function, "\tOrphaned File: %s", ZOR_SHOWN(path));
+        return WalkStep::proceed;
+    });
+    if (status < 0)
+        log_.write(logLevelError, function, "FTS returned error for %s : %s", url.c_str(), errorText(-status));
+}
+
+std::uint64_t ZORFileManager::diskUsageForURL(const FileURL& url) {
+    constexpr const char* function = "diskUsageForURL";
+    if (url.empty()) {
+        log_.write(logLevelError, function, "Failed to get path to url %s", url.c_str());
+        return 0;
+    }
+    const auto directory = resolver_.openDirectory(url);
+    if (!directory) {
+        log_.write(logLevelError, function, "Failed to open directory %s : %s", url.c_str(),
+                   errorText(directory.error()));
+        return 0;
+    }
+    fs::UsageLog usageLog;
+    usageLog.write = [&](int level, const std::string& message) { log_.writeText(level, function, message); };
+    usageLog.levelMax = log_.writes(logLevelDebug) ? logLevelDebug : logLevelError;
+    return fs::diskUsage(directory->get(), url.path(), usageLog);
+}
+
+} // namespace zor

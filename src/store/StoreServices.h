@@ -1,0 +1,41 @@
+// SPDX-License-Identifier: Apache-2.0
+// What the container operations call: one object of each service, made by the composition and alive as long as it.
+#pragma once
+
+#include "daemon/base/ZORException.h"
+#include "daemon/base/ZORLocks.h"
+#include "fs/Durability.h"
+#include "fs/ZORFileManager.h"
+#include "platform/Queries.h"
+#include "platform/SandboxUserState.h"
+#include "platform/ServiceTransaction.h"
+#include "platform/WorkQueue.h"
+#include "store/ZORContainerCache.h"
+#include "store/ZORGlobalConfiguration.h"
+
+namespace zor {
+
+class ZOREntitlementMapping;
+class ZORWhitelist;
+
+struct StoreServices {
+    const Log& log;
+    ExceptionBoundary& boundary;
+    ZORLocks& locks;
+    ZORFileManager& fileManager;
+    fs::Durability& durability;
+    ZORGlobalConfiguration& configuration;
+    ZORContainerCache& cache;
+    ZOREntitlementMapping& entitlements;
+    const ZORWhitelist& whitelist;
+    const platform::InternalBuildQuery& internalBuild;
+    platform::SandboxUserState& sandbox;
+    platform::WorkQueue& deathRowQueue;
+    platform::ServiceTransactions& transactions;
+};
+
+/// Runs `job` later on a queue; the daemon counts as busy until it has run.
+void ZORDispatchAsyncWithTransaction(platform::ServiceTransactions& transactions, platform::WorkQueue& queue,
+                                     std::function<void()> job);
+
+} // namespace zor

@@ -1,0 +1,224 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "store/ZORContainerCache.h"
+
+#include "daemon/base/UserIdentity.h"
+#include "fs/OwnedFile.h"
+#include "platform/BlockingScope.h"
+#include "store/ClassDirectoryReader.h"
+#include "store/Names.h"
+
+#include <cerrno>
+#include <fcntl.h>
+
+namespace zor {
+
+using platform::MutexLock;
+
+namespace {
+
+const char* suffix(bool transient) { return transient ? "(transient)" : ""; }
+
+long number(ContainerClass containerClass) { return static_cast<long>(containerClass); }
+
+} // namespace
+
+ZORError ZORContainerCache::failedToRebuild(Here here, const Key& key, const ZORError& cause) {
+    return makeError(log_, here, ErrorCode::cacheNotRebuilt, &cause, LogFlag::yes, "Cache: %u-%s%s: Failed to rebuild",
+                     key.userId, className(key.containerClass), suffix(key.transient));
+}
+
+Result<ZORContainerCache::ClassCache*> ZORContainerCache::_getCacheForUserId(const Key& key) {
+    if (!userIdIsValidForClass(key.containerClass, key.userId))
+        return makeError(log_, ZOR_HERE, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
+                         "Invalid cache get-userId %u for class %ld", key.userId, number(key.containerClass));
+    const auto known = caches_.find(key);
+    if (known != caches_.end())
+        return &known->second;
+    ZOR_LOG(log_, logLevelDebug, "Rebuilding container class cache: %u-%s%s", key.userId, className(key.containerClass),
+            suffix(key.transient));
+    const platform::BlockingScope blocking;
+    ClassCache built = TRY(readClassDirectory(key));
+    return &caches_.emplace(key, std::move(built)).first->second;
+}
+
+Result<ZORContainerCache::ClassCache> ZORContainerCache::readClassDirectory(const Key& key) {
+    const auto directory = configuration_.containerDirectoryURLForUser(key.userId, key.containerClass, key.transient);
+    if (!directory)
+        return posixError(ZOR_HERE, ENOENT, "User %u has no directory for class %s", key.userId,
+                          className(key.containerClass));
+    ClassDirectoryReader reader(log_, fileManager_, *directory, key.userId);
+    ClassCache cache;
+    TRY(reader.forEach([&](Record record) {
+        record->setTransient(key.transient);
+        store(cache, std::move(record));
+    }));
+    // A daemon that was killed may have left containers here that are not on the disk yet; who finds one here is told that it
+    // exists.
+    const auto opened = fileManager_.resolver().openDirectory(*directory);
+    const int synced = opened ? durability_.afterMove(opened->get()) : -opened.error();
+    if (synced < 0)
+        return posixError(ZOR_HERE, -synced, "sync of %s failed: %s", directory->c_str(), errorText(-synced));
+    return cache;
+}
+
+void ZORContainerCache::store(ClassCache& cache, Record record) {
+    const auto known = cache.find(record);
+    if (known != cache.end())
+        cache.erase(known);
+    cache.insert(std::move(record));
+}
+
+Result<ZORContainerCache::Record> ZORContainerCache::findRecord(const Key& key, const std::string& identifier) {
+    const MutexLock held(cacheLock_);
+    const auto cache = _getCacheForUserId(key);
+    if (!cache)
+        return failedToRebuild({"containerForUser", __LINE__}, key, cache.error());
+    const auto found = (*cache)->find(std::string_view(identifier));
+    if (found == (*cache)->end())
+        return makeError(log_, {"containerForUser", __LINE__}, ErrorCode::notFound, nullptr, LogFlag::no,
+                         "Cache: %s%s: Container Not Found with ID: %s", className(key.containerClass),
+                         suffix(key.transient), ZOR_SHOWN(identifier));
+    return *found;
+}
+
+Result<void> ZORContainerCache::checkOnDisk(Here here, const Key& key, const ZORMetadata& record,
+                                            const char* foundFormatPrefix) {
+    if (!record.hasUrl())
+        return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes, "Cache: %s%s: nil URL from %s",
+                         className(key.containerClass), suffix(key.transient), "(null)");
+    const FileURL file = record.url().appendingFile(names::metadataFile);
+    // A link or anything else in the file's place is no metadata file: the owner of the container can put it there.
+    const auto item = fileManager_.resolver().openItem(file, O_PATH);
+    struct stat status {};
+    if (item && ::fstat(item->get(), &status) == 0 && S_ISREG(status.st_mode)) {
+        ZOR_LOG(log_, logLevelDebug, "Cache: %s%s: %s Identifier: %s", className(key.containerClass),
+                suffix(key.transient), foundFormatPrefix, ZOR_SHOWN(record.identifier()));
+        return {};
+    }
+    if (!item && item.error() != ENOENT)
+        log_.write(logLevelError, "itemExistsAtURL", "Failed to determine if %s exists: %s", file.c_str(),
+                   errorText(item.error()));
+    return makeError(log_, here, ErrorCode::cachedContainerWithoutMetadata, nullptr, LogFlag::yes,
+                     "Cache: %s%s: INCONSISTENT-No Metadata at: %s", className(key.containerClass),
+                     suffix(key.transient), file.c_str());
+}
+
+Result<ZORContainerCache::Record> ZORContainerCache::containerForUser(std::uint32_t userId,
+                                                                      ContainerClass containerClass,
+                                                                      const std::string* identifier, bool transient) {
+    return boundary_.run(ZOR_HERE, [&]() -> Result<Record> {
+        const Here here{"containerForUser", __LINE__};
+        if (!isValidClass(containerClass))
+            return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
+                             "Invalid Content Class: %ld", number(containerClass));
+        if (!identifier)
+            return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes, "Invalid identifier: %s",
+                             "(null)");
+        const Key key{userId, containerClass, transient};
+        Record record = TRY(findRecord(key, *identifier));
+        TRY(checkOnDisk(here, key, *record, "Found"));
+        return record;
+    });
+}
+
+ZORContainerCache::Record ZORContainerCache::containerForUser(std::uint32_t userId, ContainerClass containerClass,
+                                                              const std::string* identifier,
+                                                              std::string_view uuidString) {
+    for (const bool transient : {false, true}) {
+        const auto record = containerForUser(userId, containerClass, identifier, transient);
+        if (record && (*record)->uuid().string() == uuidString) {
+            (*record)->setTransient(transient);
+            return *record;
+        }
+    }
+    return nullptr;
+}
+
+Result<std::vector<ZORContainerCache::Record>>
+ZORContainerCache::allContainersForUser(std::uint32_t userId, ContainerClass containerClass, bool transient) {
+    return boundary_.run(ZOR_HERE, [&]() -> Result<std::vector<Record>> {
+        const Here here{"allContainersForUser", __LINE__};
+        if (!isValidClass(containerClass))
+            return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
+                             "Invalid Content Class: %ld", number(containerClass));
+        const Key key{userId, containerClass, transient};
+        std::vector<Record> records;
+        {
+            const MutexLock held(cacheLock_);
+            const auto cache = _getCacheForUserId(key);
+            if (!cache)
+                return failedToRebuild(here, key, cache.error());
+            records.assign((*cache)->begin(), (*cache)->end());
+        }
+        std::erase_if(records,
+                      [&](const Record& record) { return !checkOnDisk(here, key, *record, "ALL Found").has_value(); });
+        return records;
+    });
+}
+
+Result<void> ZORContainerCache::addContainerMetadata(const Record& record, std::uint32_t userId, ContainerPlace place,
+                                                     bool transient) {
+    return boundary_.run(ZOR_HERE, [&]() -> Result<void> {
+        const Here here{"addContainerMetadata", __LINE__};
+        if (!isValidClass(record->containerClass()))
+            return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
+                             "Invalid Metadata Content Class: %lld",
+                             static_cast<long long>(record->containerClass()));
+        if (place.empty())
+            return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes, "Invalid input: URL: %s",
+                             "(null)");
+        const Key key{userId, record->containerClass(), transient};
+        {
+            const MutexLock held(cacheLock_);
+            const auto cache = _getCacheForUserId(key);
+            if (!cache)
+                return failedToRebuild(here, key, cache.error());
+            record->setPlace(std::move(place));
+            store(**cache, record);
+        }
+        ZOR_LOG(log_, logLevelDebug, "Cache: %s%s: Added Identifier: %s", className(key.containerClass),
+                suffix(transient), ZOR_SHOWN(record->identifier()));
+        return {};
+    });
+}
+
+Result<void> ZORContainerCache::removeContainerForUser(std::uint32_t userId, ContainerClass containerClass,
+                                                       const std::string* identifier, bool transient) {
+    return boundary_.run(ZOR_HERE, [&]() -> Result<void> {
+        const Here here{"removeContainerForUser", __LINE__};
+        if (!isValidClass(containerClass))
+            return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
+                             "Invalid Content Class: %ld", number(containerClass));
+        if (!identifier)
+            return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes, "Invalid Identifier: %s",
+                             "(null)");
+        const Key key{userId, containerClass, transient};
+        {
+            const MutexLock held(cacheLock_);
+            const auto cache = _getCacheForUserId(key);
+            if (!cache)
+                return failedToRebuild(here, key, cache.error());
+            const auto known = (*cache)->find(std::string_view(*identifier));
+            if (known != (*cache)->end())
+                (*cache)->erase(known);
+        }
+        ZOR_LOG(log_, logLevelDebug, "Cache: %s%s: Removed Identifier: %s", className(containerClass),
+                suffix(transient), ZOR_SHOWN(*identifier));
+        return {};
+    });
+}
+
+void ZORContainerCache::dropAll() {
+    const MutexLock held(cacheLock_);
+    caches_.clear();
+}
+
+ZORContainerCache::Counts ZORContainerCache::counts() {
+    const MutexLock held(cacheLock_);
+    Counts counts{.classCaches = caches_.size()};
+    for (const auto& [key, cache] : caches_)
+        counts.records += cache.size();
+    return counts;
+}
+
+} // namespace zor

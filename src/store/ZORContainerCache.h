@@ -1,0 +1,97 @@
+// SPDX-License-Identifier: Apache-2.0
+// Finds containers without scanning the disk: for each user, class and transient flag, the records by identifier.
+//
+// Such a class cache is built from disk when it is first needed and kept; only adding and removing change it, and the setup
+// drops all of them once, before the first client. The disk is the truth all the same: a lookup that returns a record has just
+// seen its metadata file. Code 21 is the one answer that means "does not exist"; every other failure means "not known".
+//
+// One mutex guards the class caches and is held while one is built; the checks on disk run after it is released. Who needs a
+// lookup and a later add to be one step holds the identifier locks around both. Exceptions end at these operations (code 40).
+#pragma once
+
+#include "daemon/base/ContainerClass.h"
+#include "daemon/base/Result.h"
+#include "daemon/base/ZORException.h"
+#include "fs/Durability.h"
+#include "platform/Mutex.h"
+#include "store/ZORGlobalConfiguration.h"
+#include "store/ZORMetadata.h"
+
+#include <map>
+#include <memory>
+#include <string>
+#include <string_view>
+#include <unordered_set>
+#include <vector>
+
+namespace zor {
+
+class ZORContainerCache {
+public:
+    using Record = std::shared_ptr<ZORMetadata>;
+
+    ZORContainerCache(const Log& log, ZORFileManager& fileManager, ZORGlobalConfiguration& configuration,
+                      fs::Durability& durability, ExceptionBoundary& boundary)
+        : log_(log), fileManager_(fileManager), configuration_(configuration), durability_(durability),
+          boundary_(boundary) {}
+    ZORContainerCache(const ZORContainerCache&) = delete;
+    ZORContainerCache& operator=(const ZORContainerCache&) = delete;
+
+    /// The cache's own record of the identifier. `identifier` nullptr: error 47.
+    Result<Record> containerForUser(std::uint32_t userId, ContainerClass containerClass, const std::string* identifier,
+                                    bool transient);
+    /// The record whose internal UUID is `uuidString` (upper-case), live before transient; its transient flag is set
+    /// accordingly. nullptr when there is none.
+    Record containerForUser(std::uint32_t userId, ContainerClass containerClass, const std::string* identifier,
+                            std::string_view uuidString);
+    /// Every record whose metadata file is still there.
+    Result<std::vector<Record>> allContainersForUser(std::uint32_t userId, ContainerClass containerClass,
+                                                     bool transient);
+    /// Stores the record under its identifier, at `place`, over any other of that identifier.
+    Result<void> addContainerMetadata(const Record& record, std::uint32_t userId, ContainerPlace place, bool transient);
+    Result<void> removeContainerForUser(std::uint32_t userId, ContainerClass containerClass,
+                                        const std::string* identifier, bool transient);
+
+    /// Forgets every class cache; each is built anew when it is next needed.
+    void dropAll() ZOR_EXCLUDES(cacheLock_);
+    /// For the status: class caches and the records in them.
+    struct Counts {
+        std::size_t classCaches = 0;
+        std::size_t records = 0;
+    };
+    [[nodiscard]] Counts counts() ZOR_EXCLUDES(cacheLock_);
+
+private:
+    struct IdentifierOf {
+        using is_transparent = void;
+        static std::string_view of(std::string_view identifier) { return identifier; }
+        static std::string_view of(const Record& record) { return record->identifier(); }
+        std::size_t operator()(const auto& key) const { return std::hash<std::string_view>()(of(key)); }
+        bool operator()(const auto& left, const auto& right) const { return of(left) == of(right); }
+    };
+    using ClassCache = std::unordered_set<Record, IdentifierOf, IdentifierOf>;
+    struct Key {
+        std::uint32_t userId;
+        ContainerClass containerClass;
+        bool transient;
+        auto operator<=>(const Key&) const = default;
+    };
+
+    Result<ClassCache*> _getCacheForUserId(const Key& key) ZOR_REQUIRES(cacheLock_);
+    Result<ClassCache> readClassDirectory(const Key& key);
+    Result<Record> findRecord(const Key& key, const std::string& identifier) ZOR_EXCLUDES(cacheLock_);
+    ZORError failedToRebuild(Here here, const Key& key, const ZORError& cause);
+    /// Code 44 or 47 unless the record's metadata file is there.
+    Result<void> checkOnDisk(Here here, const Key& key, const ZORMetadata& record, const char* foundFormatPrefix);
+    static void store(ClassCache& cache, Record record);
+
+    const Log& log_;
+    ZORFileManager& fileManager_;
+    ZORGlobalConfiguration& configuration_;
+    fs::Durability& durability_;
+    ExceptionBoundary& boundary_;
+    platform::Mutex cacheLock_;
+    std::map<Key, ClassCache> caches_ ZOR_GUARDED_BY(cacheLock_);
+};
+
+} // namespace zor

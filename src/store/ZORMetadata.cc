@@ -1,0 +1,169 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "store/ZORMetadata.h"
+
+#include "fs/DictionaryFile.h"
+#include "fs/OwnedFile.h"
+#include "plist/Binary.h"
+#include "plist/Read.h"
+#include "store/Names.h"
+
+#include <fcntl.h>
+
+namespace zor {
+
+namespace {
+
+// Keys of the file.
+constexpr std::string_view contentClassKey = "ZORMetadataContentClass"; // integer
+constexpr std::string_view personaKey = "ZORMetadataPersona";           // integer; may be missing
+constexpr std::string_view identifierKey = "ZORMetadataIdentifier";     // string
+constexpr std::string_view uuidKey = "ZORMetadataUUID";                 // string
+constexpr std::string_view infoKey = "ZORMetadataInfo";                 // dictionary; may be missing
+
+template <typename... Arguments>
+ZORError refusal(ErrorCode code, int line, const char* format, Arguments... arguments) {
+    return {Here{"readAndValidateMetadataAtUrl", line}, ErrorDomain::zor, static_cast<int>(code),
+            formatted(format, arguments...)};
+}
+
+/// The 64 bits of an integer of either sign, as the file's readers take it.
+std::optional<std::uint64_t> integerBits(const plist::Value& value) {
+    if (const auto number = value.asUnsigned())
+        return number;
+    if (const auto number = value.asSigned())
+        return static_cast<std::uint64_t>(*number);
+    return std::nullopt;
+}
+
+std::string_view withoutLastComponent(std::string_view path) { return path.substr(0, path.rfind('/')); }
+
+} // namespace
+
+#define ZOR_REFUSE(...) return refusal(ErrorCode::metadataInvalid, __LINE__, __VA_ARGS__)
+
+ContainerPlace::ContainerPlace(std::shared_ptr<const std::string> parentPath, std::string_view name)
+    : parentPath_(std::move(parentPath)) {
+    const auto uuid = UUID::parse(name);
+    if (uuid && uuid->string() == name)
+        uuid_ = *uuid;
+    else
+        otherName_ = std::make_shared<const std::string>(name);
+}
+
+ContainerPlace::ContainerPlace(const FileURL& url)
+    : ContainerPlace(std::make_shared<const std::string>(url.deletingLastPathComponent().path()),
+                     url.lastPathComponent()) {}
+
+FileURL ContainerPlace::url() const {
+    if (empty())
+        return {};
+    std::string path;
+    path.reserve(parentPath_->size() + 1 + (otherName_ ? otherName_->size() : 36));
+    path += *parentPath_;
+    path += '/';
+    path += name();
+    return FileURL::directory(std::move(path));
+}
+
+plist::Dictionary ZORMetadata::fileContent() const {
+    plist::Dictionary content{
+        {std::string(contentClassKey), static_cast<std::uint64_t>(containerClass_)},
+        {std::string(personaKey), uid_},
+        {std::string(identifierKey), identifier_},
+        {std::string(uuidKey), uuid_.string()},
+    };
+    if (info_)
+        content.set(infoKey, *info_);
+    return content;
+}
+
+Result<void> ZORMetadata::writeMetadataToDiskWithError(const Log& log, ZORFileManager& fileManager) const {
+    const FileURL container = url();
+    const auto written = writeToURL(fileContent(), container.appendingFile(names::metadataFile),
+                                    writeAtomically | writeWithoutProtection, fileManager);
+    if (!written)
+        return makeError(log, ZOR_HERE, ErrorCode::propertyListNotWritten, &written.error(), LogFlag::yes,
+                         "Failed to write metadata dictionary to URL %s", container.c_str());
+    return {};
+}
+
+Result<std::shared_ptr<ZORMetadata>> parseMetadata(std::span<const std::uint8_t> bytes, const ContainerPlace& place,
+                                                   std::uint32_t userId, CheckClassPath checkClassPath) {
+    const auto value = plist::readPropertyList(bytes);
+    const plist::Dictionary* content = value ? value->asDictionary() : nullptr;
+    if (!content)
+        return refusal(ErrorCode::metadataUnreadable, __LINE__, "Failed to read metadata at URL %s",
+                       place.url().c_str());
+    const plist::Value* persona = content->find(personaKey);
+    if (persona) {
+        const auto stored = integerBits(*persona);
+        if (!stored || static_cast<std::uint32_t>(*stored) != userId)
+            ZOR_REFUSE("Incorrect UserId: %s, expecting: %u at %s", plist::describe(persona).c_str(), userId,
+                       place.url().c_str());
+    }
+    const std::string* identifier = content->string(identifierKey);
+    if (!identifier)
+        ZOR_REFUSE("Invalid metadata Identifier: %s at %s", plist::describe(content->find(identifierKey)).c_str(),
+                   place.url().c_str());
+    const std::string* uuidString = content->string(uuidKey);
+    if (!uuidString)
+        ZOR_REFUSE("Invalid metadata UUID String: %s at %s", plist::describe(content->find(uuidKey)).c_str(),
+                   place.url().c_str());
+    const auto uuid = UUID::parse(*uuidString);
+    if (!uuid)
+        ZOR_REFUSE("Invalid metadata UUID: %s at %s", ZOR_SHOWN(*uuidString), place.url().c_str());
+    const plist::Value* classValue = content->find(contentClassKey);
+    const auto classNumber = classValue ? integerBits(*classValue) : std::nullopt;
+    if (!classNumber)
+        ZOR_REFUSE("Invalid metadata Class: %s at %s", plist::describe(classValue).c_str(), place.url().c_str());
+    if (!ipc::isContainerClass(*classNumber))
+        ZOR_REFUSE("Invalid metadata Content Class: %ld at %s", static_cast<long>(*classNumber), place.url().c_str());
+    const auto containerClass = static_cast<ContainerClass>(*classNumber);
+    const plist::Value* info = content->find(infoKey);
+    if (info && !info->asDictionary())
+        ZOR_REFUSE("Invalid metadata Info: %s at %s", plist::describe(info).c_str(), place.url().c_str());
+    if (checkClassPath == CheckClassPath::yes) {
+        // The class directory is named by two components; a record proves that it lies in the one of its own class.
+        const std::string_view base = withoutLastComponent(withoutLastComponent(place.parentPath()));
+        const std::string expected = std::string(base) + "/" + className(containerClass);
+        if (expected != place.parentPath())
+            ZOR_REFUSE("Invalid metadata-URLs should match: %s : %s", place.url().c_str(), expected.c_str());
+    }
+    return std::make_shared<ZORMetadata>(
+        userId, *uuid, containerClass, *identifier,
+        info ? std::make_shared<const plist::Dictionary>(*info->asDictionary()) : nullptr, place);
+}
+
+MetadataReader::MetadataReader(int directory, std::shared_ptr<const std::string> parentPath, std::uint32_t userId,
+                               CheckClassPath checkClassPath)
+    : directory_(directory), parentPath_(std::move(parentPath)), userId_(userId), checkClassPath_(checkClassPath) {}
+
+Result<std::shared_ptr<ZORMetadata>> MetadataReader::read(const char* name) const {
+    const ContainerPlace place(parentPath_, name);
+    const std::string relative = std::string(name) + "/" + names::metadataFile;
+    const auto bytes = fs::readOwnedFile(directory_, relative.c_str(), fs::metadataFileBytesMax);
+    if (!bytes) {
+        const ZORError cause = posixError(ZOR_HERE, bytes.error(), "%s", errorText(bytes.error()));
+        return ZORError(Here{"readAndValidateMetadataAtUrl", __LINE__}, ErrorDomain::zor,
+                        static_cast<int>(ErrorCode::metadataUnreadable),
+                        formatted("Failed to read metadata at URL %s", place.url().c_str()),
+                        std::make_shared<const ZORError>(cause));
+    }
+    return parseMetadata(*bytes, place, userId_, checkClassPath_);
+}
+
+Result<std::shared_ptr<ZORMetadata>> readAndValidateMetadataAtUrl(const Log& log, ZORFileManager& fileManager,
+                                                                  const FileURL& url, std::uint32_t userId,
+                                                                  CheckClassPath checkClassPath) {
+    const FileURL parent = url.deletingLastPathComponent();
+    const auto directory = fileManager.resolver().openDirectoryPath(parent);
+    // Without its directory, the read below says what is wrong with the container.
+    const MetadataReader reader(directory ? directory->get() : -1, std::make_shared<const std::string>(parent.path()),
+                                userId, checkClassPath);
+    auto record = reader.read(std::string(url.lastPathComponent()).c_str());
+    if (!record)
+        logError(log, record.error());
+    return record;
+}
+
+} // namespace zor

@@ -1,0 +1,122 @@
+// SPDX-License-Identifier: Apache-2.0
+// The record of one container, and the file in the container that it is read from and written to.
+//
+// The file is all that lasts; a record is its copy in memory plus where the container lies. Records in the cache are shared
+// between threads and have no lock: whoever changes one holds the identifier or all-identifiers lock of the operation, and what a
+// reply needs is read before that lock is released. There may be hundreds of thousands of records, so one holds no more
+// than its data: directories are shared between the records that lie in them, and a directory name that is a UUID is kept as
+// its 16 bytes.
+#pragma once
+
+#include "daemon/base/ContainerClass.h"
+#include "daemon/base/FileURL.h"
+#include "daemon/base/Result.h"
+#include "daemon/base/UUID.h"
+#include "fs/ZORFileManager.h"
+#include "plist/Value.h"
+
+#include <atomic>
+#include <memory>
+#include <optional>
+#include <span>
+#include <string>
+
+namespace zor {
+
+/// Where a container lies: a directory that many share, and its own name in it.
+class ContainerPlace {
+public:
+    ContainerPlace() = default;
+    ContainerPlace(std::shared_ptr<const std::string> parentPath, std::string_view name);
+    explicit ContainerPlace(const FileURL& url);
+
+    [[nodiscard]] bool empty() const { return !parentPath_; }
+    [[nodiscard]] std::string name() const { return otherName_ ? *otherName_ : uuid_.string(); }
+    [[nodiscard]] const std::string& parentPath() const { return *parentPath_; }
+    [[nodiscard]] FileURL url() const;
+
+private:
+    std::shared_ptr<const std::string> parentPath_;
+    UUID uuid_;
+    std::shared_ptr<const std::string> otherName_; // when the name is not a UUID in canonical form
+};
+
+class ZORMetadata {
+public:
+    using Info = std::shared_ptr<const plist::Dictionary>;
+
+    /// No checks. `info` may be nullptr.
+    ZORMetadata(std::uint32_t uid, UUID uuid, ContainerClass containerClass, std::string identifier, Info info,
+                ContainerPlace place)
+        : identifier_(std::move(identifier)), info_(std::move(info)), place_(std::move(place)), uuid_(uuid), uid_(uid),
+          containerClass_(static_cast<std::uint8_t>(containerClass)) {}
+
+    [[nodiscard]] std::uint32_t uid() const { return uid_; }
+    void setUid(std::uint32_t uid) { uid_ = uid; }
+    /// The internal UUID, which clients know; not the one in the directory's name.
+    [[nodiscard]] const UUID& uuid() const { return uuid_; }
+    void setUuid(const UUID& uuid) { uuid_ = uuid; }
+    [[nodiscard]] ContainerClass containerClass() const { return static_cast<ContainerClass>(containerClass_); }
+    [[nodiscard]] const std::string& identifier() const { return identifier_; }
+    [[nodiscard]] const Info& info() const { return info_; }
+    void setInfo(Info info) { info_ = std::move(info); }
+    [[nodiscard]] bool hasUrl() const { return !place_.empty(); }
+    [[nodiscard]] FileURL url() const { return place_.url(); }
+    void setPlace(ContainerPlace place) { place_ = std::move(place); }
+    [[nodiscard]] bool transient() const { return transient_; }
+    void setTransient(bool transient) { transient_ = transient; }
+    [[nodiscard]] bool existed() const { return existed_; }
+    void setExisted(bool existed) { existed_ = existed; }
+    /// False from its creation until the move into its class directory has been synced; then true for ever. The one field
+    /// that is changed without the identifier locks.
+    [[nodiscard]] bool durable() const { return durable_.load(std::memory_order_acquire); }
+    void setDurable(bool durable) { durable_.store(durable, std::memory_order_release); }
+
+    /// The dictionary that the file holds.
+    [[nodiscard]] plist::Dictionary fileContent() const;
+
+    /// Replaces the file in one step. Error 34; the previous file is then untouched.
+    Result<void> writeMetadataToDiskWithError(const Log& log, ZORFileManager& fileManager) const;
+
+private:
+    std::string identifier_;
+    Info info_;
+    ContainerPlace place_;
+    UUID uuid_;
+    std::uint32_t uid_;
+    std::uint8_t containerClass_;
+    bool transient_ = false;
+    bool existed_ = false;
+    std::atomic<bool> durable_{true};
+};
+
+enum class CheckClassPath { no, yes };
+
+/// Reads and judges the metadata of the container at `url` for a user; errors 12 and 29, logged. Changes nothing.
+Result<std::shared_ptr<ZORMetadata>> readAndValidateMetadataAtUrl(const Log& log, ZORFileManager& fileManager,
+                                                                  const FileURL& url, std::uint32_t userId,
+                                                                  CheckClassPath checkClassPath);
+
+/// Reads many containers of one directory: the directory is open, and nothing about it is worked out twice.
+/// Errors are made without a log line, so that threads may share the work and one of them can say the errors in order.
+class MetadataReader {
+public:
+    /// `directory` is open and stays so; `parentPath` is its path.
+    MetadataReader(int directory, std::shared_ptr<const std::string> parentPath, std::uint32_t userId,
+                   CheckClassPath checkClassPath);
+    /// The container `name` in the directory. Any thread.
+    [[nodiscard]] Result<std::shared_ptr<ZORMetadata>> read(const char* name) const;
+
+private:
+    const int directory_;
+    const std::shared_ptr<const std::string> parentPath_;
+    const std::uint32_t userId_;
+    const CheckClassPath checkClassPath_;
+};
+
+/// The judgement alone, on the bytes of a file: what a fuzzer calls.
+[[nodiscard]] Result<std::shared_ptr<ZORMetadata>> parseMetadata(std::span<const std::uint8_t> bytes,
+                                                                 const ContainerPlace& place, std::uint32_t userId,
+                                                                 CheckClassPath checkClassPath);
+
+} // namespace zor
