@@ -1,0 +1,260 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "support/PowerCut.h"
+
+#include <algorithm>
+#include <random>
+
+namespace zor::support {
+
+namespace {
+
+/// More uncertain changes than this are not lost or kept one by one; the seeded choice has to do.
+constexpr std::size_t singleChangesMax = 24;
+
+std::string describeLog(const DiskLog& log, std::size_t done) {
+    std::string text;
+    for (std::size_t i = 0; i < done; ++i)
+        text += "\n  #" + std::to_string(i) + " " + log.operations[i].describe();
+    return text;
+}
+
+} // namespace
+
+PowerCut::PowerCut(const DiskLog& log, const PowerCutOptions& options) : log_(log), options_(options) {
+    std::map<std::pair<InodeId, std::string>, std::size_t> lastChange;
+    for (std::size_t i = 0; i < log_.operations.size(); ++i) {
+        const LoggedOperation& operation = log_.operations[i];
+        startedFrom_.emplace_back();
+        if (!operation.changesNames())
+            continue;
+        const auto take = [&](InodeId directory, const std::string& name) {
+            const auto [last, isFirst] = lastChange.emplace(std::pair(directory, name), i);
+            if (!isFirst)
+                startedFrom_[i].push_back(std::exchange(last->second, i));
+        };
+        take(operation.directory, operation.name);
+        if (operation.call == DiskCall::rename)
+            take(operation.toDirectory, operation.toName);
+    }
+}
+
+std::size_t PowerCut::committedPrefix(std::size_t done) const {
+    std::size_t prefix = 0;
+    for (std::size_t s = 0; s < done; ++s) {
+        const LoggedOperation& operation = log_.operations[s];
+        if (operation.call == DiskCall::syncFileSystem)
+            prefix = s;
+        if (operation.call != DiskCall::sync)
+            continue;
+        for (std::size_t i = s; i > prefix; --i) {
+            if (log_.operations[i - 1].touches(operation.inode))
+                prefix = i;
+        }
+    }
+    return prefix;
+}
+
+bool PowerCut::dataIsSynced(std::size_t write, std::size_t done) const {
+    for (std::size_t s = write + 1; s < done; ++s) {
+        const LoggedOperation& operation = log_.operations[s];
+        if (operation.call == DiskCall::syncFileSystem ||
+            (operation.call == DiskCall::sync && operation.inode == log_.operations[write].inode))
+            return true;
+    }
+    return false;
+}
+
+bool PowerCut::dataIsOrdered(std::size_t write, std::size_t prefix) const {
+    for (std::size_t s = write + 1; s < prefix; ++s) {
+        const LoggedOperation& operation = log_.operations[s];
+        if (operation.call == DiskCall::orderData && operation.inode == log_.operations[write].inode)
+            return true;
+    }
+    return false;
+}
+
+bool PowerCut::isCertain(std::size_t index, std::size_t done) const {
+    const LoggedOperation& operation = log_.operations[index];
+    if (operation.writes() || operation.changesInode())
+        return dataIsSynced(index, done);
+    for (std::size_t s = index + 1; s < done; ++s) {
+        const LoggedOperation& sync = log_.operations[s];
+        if (sync.call == DiskCall::syncFileSystem ||
+            (sync.call == DiskCall::sync && (sync.inode == operation.directory || sync.inode == operation.toDirectory)))
+            return true;
+    }
+    return false;
+}
+
+void PowerCut::completeBackwards(std::vector<bool>& persisted) const {
+    for (std::size_t i = persisted.size(); i-- > 0;) {
+        if (!persisted[i])
+            continue;
+        for (const std::size_t earlier : startedFrom_[i])
+            persisted[earlier] = true;
+    }
+}
+
+std::vector<PowerCut::Choice> PowerCut::orderedChoices(std::size_t done) const {
+    std::mt19937_64 random(options_.seed * 1'000'003 + done);
+    const std::size_t committed = committedPrefix(done);
+    std::vector<std::size_t> prefixes = {committed};
+    for (std::size_t i = committed; i < done; ++i) {
+        const LoggedOperation& operation = log_.operations[i];
+        if (operation.changesNames() || operation.changesInode() || operation.call == DiskCall::orderData)
+            prefixes.push_back(i + 1);
+    }
+    std::vector<Choice> choices;
+    const auto choose = [&](std::size_t prefix, const std::function<DataFate()>& fate) {
+        Choice choice{std::vector<bool>(done), std::vector<DataFate>(done, DataFate::kept),
+                      std::vector<std::size_t>(done)};
+        for (std::size_t i = 0; i < done; ++i) {
+            choice.persisted[i] = i < prefix;
+            if (!log_.operations[i].writes() || dataIsSynced(i, done) || dataIsOrdered(i, prefix))
+                continue;
+            choice.data[i] = fate();
+            choice.cutTo[i] = random() % log_.operations[i].value.content.size();
+        }
+        choices.push_back(std::move(choice));
+    };
+    std::vector<std::size_t> tried = prefixes;
+    if (tried.size() > singleChangesMax) {
+        std::shuffle(tried.begin() + 1, tried.end() - 1, random);
+        std::swap(tried[1], tried.back());
+        tried.resize(singleChangesMax);
+    }
+    for (const std::size_t prefix : tried) {
+        for (const DataFate fate : {DataFate::lost, DataFate::kept, DataFate::zeros, DataFate::cut})
+            choose(prefix, [&] { return fate; });
+    }
+    for (std::size_t i = 0; i < options_.randomStatesPerCut; ++i)
+        choose(prefixes[random() % prefixes.size()], [&] { return static_cast<DataFate>(random() % 4); });
+    return choices;
+}
+
+std::vector<PowerCut::Choice> PowerCut::unorderedChoices(std::size_t done) const {
+    std::mt19937_64 random(options_.seed * 1'000'003 + done);
+    std::vector<bool> certain(done);
+    for (std::size_t i = 0; i < done; ++i)
+        certain[i] = isCertain(i, done);
+    completeBackwards(certain);
+    std::vector<std::size_t> uncertain;
+    for (std::size_t i = 0; i < done; ++i) {
+        const LoggedOperation& operation = log_.operations[i];
+        if (!certain[i] && (operation.changesNames() || operation.changesInode() || operation.writes()))
+            uncertain.push_back(i);
+    }
+    std::vector<Choice> choices;
+    const auto choose = [&](const std::function<bool(std::size_t)>& isThere,
+                            const std::function<DataFate()>& lostFate) {
+        Choice choice{certain, std::vector<DataFate>(done, DataFate::kept), std::vector<std::size_t>(done)};
+        for (const std::size_t i : uncertain)
+            choice.persisted[i] = isThere(i);
+        completeBackwards(choice.persisted);
+        for (const std::size_t i : uncertain) {
+            if (!log_.operations[i].writes() || choice.persisted[i])
+                continue;
+            choice.data[i] = lostFate();
+            choice.cutTo[i] = random() % log_.operations[i].value.content.size();
+        }
+        choices.push_back(std::move(choice));
+    };
+    const auto all = [](std::size_t) { return true; };
+    const auto none = [](std::size_t) { return false; };
+    const auto names = [&](std::size_t i) { return log_.operations[i].changesNames(); };
+    const auto notData = [&](std::size_t i) { return !log_.operations[i].writes(); };
+    const auto notNames = [&](std::size_t i) { return !log_.operations[i].changesNames(); };
+    const auto lost = [] { return DataFate::lost; };
+    choose(none, lost);
+    choose(all, lost);
+    choose(notNames, lost);
+    choose(names, lost);
+    choose(notData, lost);
+    choose(notData, [] { return DataFate::zeros; });
+    choose(notData, [] { return DataFate::cut; });
+    std::vector<std::size_t> single = uncertain;
+    std::shuffle(single.begin(), single.end(), random);
+    single.resize(std::min(single.size(), singleChangesMax));
+    for (const std::size_t one : single) {
+        choose([&](std::size_t i) { return i != one; }, lost);
+        choose([&](std::size_t i) { return i == one; }, lost);
+    }
+    for (std::size_t i = 0; i < options_.randomStatesPerCut; ++i)
+        choose([&](std::size_t) { return random() % 2 == 0; }, [&] { return static_cast<DataFate>(random() % 4); });
+    return choices;
+}
+
+PowerCutState PowerCut::build(const Choice& choice, std::size_t done) const {
+    PowerCutState state{.tree = log_.start, .operationsDone = done};
+    state.marksPassed = static_cast<std::size_t>(
+        std::count_if(log_.marks.begin(), log_.marks.end(), [&](std::size_t mark) { return mark <= done; }));
+    // Every inode exists from the start; it is there when a persisted name reaches it.
+    for (std::size_t i = 0; i < done; ++i) {
+        if (log_.operations[i].makesInode())
+            state.tree.inodes[log_.operations[i].inode] = log_.operations[i].value;
+    }
+    for (std::size_t i = 0; i < done; ++i) {
+        LoggedOperation operation = log_.operations[i];
+        const std::string label = " #" + std::to_string(i);
+        if (operation.writes()) {
+            if (choice.data[i] == DataFate::lost) {
+                state.description += label + " data lost;";
+                continue;
+            }
+            if (choice.data[i] == DataFate::zeros) {
+                state.description += label + " data zeros;";
+                std::fill(operation.value.content.begin(), operation.value.content.end(), std::uint8_t{0});
+            } else if (choice.data[i] == DataFate::cut) {
+                state.description += label + " data cut to " + std::to_string(choice.cutTo[i]) + ";";
+                operation.value.content.resize(choice.cutTo[i]);
+            }
+        } else if (!choice.persisted[i]) {
+            if (operation.changesNames() || operation.changesInode())
+                state.description += label + " lost;";
+            continue;
+        }
+        apply(operation, state.tree);
+    }
+    return state;
+}
+
+std::vector<PowerCutState> PowerCut::statesAfter(std::size_t done) const {
+    std::vector<PowerCutState> states;
+    std::set<std::string> seen;
+    const bool ordered = options_.model == DiskModel::orderedJournal;
+    for (const Choice& choice : ordered ? orderedChoices(done) : unorderedChoices(done)) {
+        PowerCutState state = build(choice, done);
+        // Directories moved around each other may come out of a choice in a way that no file system leaves them in.
+        if (state.tree.isTree() && seen.insert(state.tree.describe()).second)
+            states.push_back(std::move(state));
+    }
+    return states;
+}
+
+LoopReport forEachPowerCut(const DiskLog& log, const PowerCutOptions& options,
+                           const std::function<std::string(const PowerCutState&, const std::string&)>& judge) {
+    const PowerCut cut(log, options);
+    LoopReport report;
+    std::set<std::pair<std::string, std::size_t>> judged;
+    for (std::size_t done = 0; done <= log.operations.size(); ++done) {
+        for (const PowerCutState& state : cut.statesAfter(done)) {
+            if (!judged.emplace(state.tree.describe(), state.marksPassed).second)
+                continue;
+            const TemporaryDirectory directory(options.scratch);
+            materialise(state.tree, directory.path());
+            ++report.examined;
+            const std::string complaint = judge(state, directory.path());
+            if (complaint.empty())
+                continue;
+            report.complaint = "power cut (" +
+                               std::string(options.model == DiskModel::unordered ? "unordered" : "ordered journal") +
+                               ", seed " + std::to_string(options.seed) + ") after " + std::to_string(done) + " of " +
+                               std::to_string(log.operations.size()) + " operations, with" + state.description + " " +
+                               complaint + describeLog(log, done);
+            return report;
+        }
+    }
+    return report;
+}
+
+} // namespace zor::support

@@ -1,0 +1,422 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "support/RecordingDisk.h"
+
+#include <algorithm>
+#include <cstdio>
+#include <cstdlib>
+#include <fcntl.h>
+#include <linux/fs.h>
+#include <unistd.h>
+
+namespace zor::support {
+
+using platform::MutexLock;
+
+namespace {
+
+void place(Bytes& content, std::uint64_t offset, const Bytes& bytes) {
+    if (content.size() < offset + bytes.size())
+        content.resize(offset + bytes.size());
+    std::copy(bytes.begin(), bytes.end(), content.begin() + static_cast<std::ptrdiff_t>(offset));
+}
+
+std::uint64_t writeOffset(int fd) {
+    const bool appends = (::fcntl(fd, F_GETFL) & O_APPEND) != 0;
+    if (!appends)
+        return static_cast<std::uint64_t>(::lseek(fd, 0, SEEK_CUR));
+    struct stat status = {};
+    ::fstat(fd, &status);
+    return static_cast<std::uint64_t>(status.st_size);
+}
+
+Bytes readAt(int fd, std::uint64_t offset, std::size_t count) {
+    Bytes bytes(count);
+    std::size_t done = 0;
+    while (done < count) {
+        const ssize_t got = ::pread(fd, bytes.data() + done, count - done, static_cast<off_t>(offset + done));
+        if (got <= 0)
+            break;
+        done += static_cast<std::size_t>(got);
+    }
+    bytes.resize(done);
+    return bytes;
+}
+
+/// The first line that only one of two descriptions has.
+std::string firstDifference(const std::string& recorded, const std::string& onDisk) {
+    if (recorded == onDisk)
+        return "";
+    std::size_t line = 0;
+    for (std::size_t i = 0; i < recorded.size() && i < onDisk.size() && recorded[i] == onDisk[i]; ++i) {
+        if (recorded[i] == '\n')
+            line = i + 1;
+    }
+    const auto lineOf = [&](const std::string& text) { return text.substr(line, text.find('\n', line) - line); };
+    return "the recorded tree has \"" + lineOf(recorded) + "\" where the disk has \"" + lineOf(onDisk) + "\"";
+}
+
+} // namespace
+
+bool LoggedOperation::makesInode() const {
+    return call == DiskCall::makeDirectory || call == DiskCall::createFile || call == DiskCall::makeSymbolicLink ||
+           call == DiskCall::makeFifo;
+}
+
+bool LoggedOperation::changesNames() const {
+    return makesInode() || call == DiskCall::makeHardLink || call == DiskCall::rename || call == DiskCall::unlinkFile ||
+           call == DiskCall::removeDirectory;
+}
+
+bool LoggedOperation::changesInode() const {
+    return call == DiskCall::changeMode || call == DiskCall::changeOwner || call == DiskCall::setAttribute;
+}
+
+bool LoggedOperation::touches(InodeId id) const {
+    const bool changes = changesNames() || changesInode() || writes() || call == DiskCall::orderData;
+    return changes && (inode == id || directory == id || toDirectory == id || replaced == id);
+}
+
+std::string LoggedOperation::describe() const {
+    std::string text = nameOf(call);
+    if (call == DiskCall::rename)
+        return text + " " + std::to_string(directory) + "/" + name + (exchange ? " <-> " : " -> ") +
+               std::to_string(toDirectory) + "/" + toName + " (" + std::to_string(inode) + ")";
+    if (changesNames())
+        return text + " " + std::to_string(directory) + "/" + name + " (" + std::to_string(inode) + ")";
+    if (inode != 0)
+        text += " " + std::to_string(inode);
+    if (call == DiskCall::setAttribute)
+        text += " " + attribute;
+    if (writes())
+        text += " " + std::to_string(value.content.size()) + " at " + std::to_string(offset);
+    return text;
+}
+
+void apply(const LoggedOperation& operation, FileTree& tree) {
+    const auto entriesOf = [&](InodeId id) -> std::map<std::string, InodeId>& { return tree.inodes.at(id).entries; };
+    if (operation.call == DiskCall::rename) {
+        if (operation.exchange)
+            entriesOf(operation.directory)[operation.name] = operation.replaced;
+        else
+            entriesOf(operation.directory).erase(operation.name);
+        entriesOf(operation.toDirectory)[operation.toName] = operation.inode;
+    } else if (operation.call == DiskCall::unlinkFile || operation.call == DiskCall::removeDirectory) {
+        entriesOf(operation.directory).erase(operation.name);
+    } else if (operation.changesNames()) {
+        entriesOf(operation.directory)[operation.name] = operation.inode;
+    } else if (operation.call == DiskCall::changeMode) {
+        tree.inodes.at(operation.inode).mode = operation.value.mode;
+    } else if (operation.call == DiskCall::changeOwner) {
+        tree.inodes.at(operation.inode).uid = operation.value.uid;
+        tree.inodes.at(operation.inode).gid = operation.value.gid;
+    } else if (operation.call == DiskCall::setAttribute) {
+        tree.inodes.at(operation.inode).attributes[operation.attribute] = operation.value.content;
+    } else if (operation.writes()) {
+        place(tree.inodes.at(operation.inode).content, operation.offset, operation.value.content);
+    }
+}
+
+RecordingDisk::RecordingDisk(platform::Disk& inner, std::string root, std::set<std::string> excluded)
+    : inner_(inner), root_([&] {
+          char canonical[PATH_MAX];
+          return std::string(::realpath(root.c_str(), canonical) != nullptr ? canonical : root.c_str());
+      }()),
+      excluded_(std::move(excluded)) {}
+
+void RecordingDisk::start() {
+    const MutexLock lock(mutex_);
+    log_ = {};
+    complaint_.clear();
+    log_.start = readTree(root_, excluded_, &known_);
+    current_ = log_.start;
+    nextId_ = current_.inodes.rbegin()->first + 1;
+    recording_ = true;
+}
+
+void RecordingDisk::mark() {
+    const MutexLock lock(mutex_);
+    log_.marks.push_back(log_.operations.size());
+}
+
+DiskLog RecordingDisk::log() const {
+    const MutexLock lock(mutex_);
+    return log_;
+}
+
+std::string RecordingDisk::complaint() const {
+    const MutexLock lock(mutex_);
+    return complaint_ + firstDifference(current_.describe(), readTree(root_, excluded_).describe());
+}
+
+InodeId RecordingDisk::find(int fd) {
+    if (!recording_)
+        return 0;
+    struct stat status = {};
+    if (::fstat(fd, &status) != 0) {
+        complaint_ += "a call on no descriptor; ";
+        return 0;
+    }
+    if (const auto found = known_.find({status.st_dev, status.st_ino}); found != known_.end())
+        return found->second;
+    char link[32];
+    char path[PATH_MAX] = {};
+    std::snprintf(link, sizeof link, "/proc/self/fd/%d", fd);
+    if (::readlink(link, path, sizeof path - 1) < 0 || !std::string_view(path).starts_with(root_ + "/"))
+        return 0;
+    const std::string below = std::string(path).substr(root_.size() + 1);
+    for (const std::string& outside : excluded_) {
+        if (below == outside || below.starts_with(outside + "/"))
+            return 0;
+    }
+    complaint_ += "a call on \"" + below + "\", which nothing recorded made; ";
+    return 0;
+}
+
+InodeId RecordingDisk::findEntry(InodeId directory, const std::string& name) const {
+    const auto& entries = current_.inodes.at(directory).entries;
+    const auto entry = entries.find(name);
+    return entry == entries.end() ? 0 : entry->second;
+}
+
+void RecordingDisk::add(LoggedOperation operation) {
+    apply(operation, current_);
+    log_.operations.push_back(std::move(operation));
+}
+
+void RecordingDisk::addNew(DiskCall call, int directory, const char* name) {
+    const InodeId parent = find(directory);
+    if (parent == 0)
+        return;
+    struct stat status = {};
+    if (::fstatat(directory, name, &status, AT_SYMLINK_NOFOLLOW) != 0) {
+        complaint_ += std::string("\"") + name + "\" went as soon as it was made; ";
+        return;
+    }
+    const InodeId id = nextId_++;
+    // The file system may use the number of an inode that is gone again: the newest one is meant.
+    known_[{status.st_dev, status.st_ino}] = id;
+    LoggedOperation operation{.call = call, .inode = id, .directory = parent, .name = name};
+    operation.value = readInode(directory, name);
+    current_.inodes[id] = operation.value;
+    add(std::move(operation));
+}
+
+void RecordingDisk::addRemoval(DiskCall call, int directory, const char* name) {
+    const InodeId parent = find(directory);
+    if (parent == 0)
+        return;
+    const InodeId id = findEntry(parent, name);
+    if (id == 0)
+        complaint_ += std::string("\"") + name + "\" was removed, which nothing recorded made; ";
+    else
+        add({.call = call, .inode = id, .directory = parent, .name = name});
+}
+
+void RecordingDisk::addChange(DiskCall call, int fd) {
+    const InodeId id = find(fd);
+    if (id == 0)
+        return;
+    struct stat status = {};
+    ::fstat(fd, &status);
+    LoggedOperation operation{.call = call, .inode = id};
+    operation.value = {.mode = status.st_mode, .uid = status.st_uid, .gid = status.st_gid};
+    add(std::move(operation));
+}
+
+void RecordingDisk::addData(int to, std::uint64_t offset, Bytes bytes) {
+    const InodeId id = find(to);
+    if (id == 0 || bytes.empty())
+        return;
+    LoggedOperation operation{.call = DiskCall::write, .inode = id};
+    operation.value.content = std::move(bytes);
+    operation.offset = offset;
+    add(std::move(operation));
+}
+
+int RecordingDisk::makeDirectory(int directory, const char* name, mode_t mode) {
+    const MutexLock lock(mutex_);
+    const int result = inner_.makeDirectory(directory, name, mode);
+    if (result == 0)
+        addNew(DiskCall::makeDirectory, directory, name);
+    return result;
+}
+
+int RecordingDisk::createFile(int directory, const char* name, mode_t mode) {
+    const MutexLock lock(mutex_);
+    const int result = inner_.createFile(directory, name, mode);
+    if (result >= 0)
+        addNew(DiskCall::createFile, directory, name);
+    return result;
+}
+
+int RecordingDisk::makeSymbolicLink(const char* target, int directory, const char* name) {
+    const MutexLock lock(mutex_);
+    const int result = inner_.makeSymbolicLink(target, directory, name);
+    if (result == 0)
+        addNew(DiskCall::makeSymbolicLink, directory, name);
+    return result;
+}
+
+int RecordingDisk::makeHardLink(int fromDirectory, const char* from, int toDirectory, const char* to) {
+    const MutexLock lock(mutex_);
+    const int result = inner_.makeHardLink(fromDirectory, from, toDirectory, to);
+    if (result != 0)
+        return result;
+    const InodeId source = find(fromDirectory);
+    const InodeId parent = find(toDirectory);
+    const InodeId id = source == 0 ? 0 : findEntry(source, from);
+    if (parent != 0 && id != 0)
+        add({.call = DiskCall::makeHardLink, .inode = id, .directory = parent, .name = to});
+    else if (parent != 0 || source != 0)
+        complaint_ += std::string("a link \"") + to + "\" to what is not recorded; ";
+    return result;
+}
+
+int RecordingDisk::makeFifo(int directory, const char* name, mode_t mode) {
+    const MutexLock lock(mutex_);
+    const int result = inner_.makeFifo(directory, name, mode);
+    if (result == 0)
+        addNew(DiskCall::makeFifo, directory, name);
+    return result;
+}
+
+int RecordingDisk::rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) {
+    const MutexLock lock(mutex_);
+    const int result = inner_.rename(fromDirectory, from, toDirectory, to, flags);
+    if (result != 0)
+        return result;
+    const InodeId source = find(fromDirectory);
+    const InodeId destination = find(toDirectory);
+    if (source == 0 && destination == 0)
+        return result;
+    const InodeId moved = source == 0 ? 0 : findEntry(source, from);
+    if (moved == 0 || destination == 0) {
+        complaint_ += std::string("a move of \"") + from + "\" from or to where nothing is recorded; ";
+        return result;
+    }
+    const InodeId replaced = findEntry(destination, to);
+    if (replaced == moved)
+        return result; // Two names of one inode: the system call does nothing.
+    add({.call = DiskCall::rename,
+         .inode = moved,
+         .directory = source,
+         .name = from,
+         .toDirectory = destination,
+         .toName = to,
+         .replaced = replaced,
+         .exchange = (flags & RENAME_EXCHANGE) != 0});
+    return result;
+}
+
+int RecordingDisk::unlinkFile(int directory, const char* name) {
+    const MutexLock lock(mutex_);
+    const int result = inner_.unlinkFile(directory, name);
+    if (result == 0)
+        addRemoval(DiskCall::unlinkFile, directory, name);
+    return result;
+}
+
+int RecordingDisk::removeDirectory(int directory, const char* name) {
+    const MutexLock lock(mutex_);
+    const int result = inner_.removeDirectory(directory, name);
+    if (result == 0)
+        addRemoval(DiskCall::removeDirectory, directory, name);
+    return result;
+}
+
+int RecordingDisk::changeMode(int fd, mode_t mode) {
+    const MutexLock lock(mutex_);
+    const int result = inner_.changeMode(fd, mode);
+    if (result == 0)
+        addChange(DiskCall::changeMode, fd);
+    return result;
+}
+
+int RecordingDisk::changeOwner(int fd, uid_t uid, gid_t gid) {
+    const MutexLock lock(mutex_);
+    const int result = inner_.changeOwner(fd, uid, gid);
+    if (result == 0)
+        addChange(DiskCall::changeOwner, fd);
+    return result;
+}
+
+int RecordingDisk::setTimes(int fd, const timespec& access, const timespec& modification) {
+    return inner_.setTimes(fd, access, modification);
+}
+
+int RecordingDisk::setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) {
+    const MutexLock lock(mutex_);
+    const int result = inner_.setAttribute(fd, name, value);
+    const InodeId id = result == 0 ? find(fd) : 0;
+    if (id == 0)
+        return result;
+    LoggedOperation operation{.call = DiskCall::setAttribute, .inode = id};
+    operation.value.content.assign(value.begin(), value.end());
+    operation.attribute = name;
+    add(std::move(operation));
+    return result;
+}
+
+int RecordingDisk::setInodeFlags(int fd, int flags) {
+    return inner_.setInodeFlags(fd, flags);
+}
+
+int RecordingDisk::write(int fd, std::span<const std::uint8_t> bytes) {
+    const MutexLock lock(mutex_);
+    const std::uint64_t offset = writeOffset(fd);
+    const int result = inner_.write(fd, bytes);
+    const auto end = static_cast<std::uint64_t>(::lseek(fd, 0, SEEK_CUR));
+    const std::size_t written = result == 0 ? bytes.size() : static_cast<std::size_t>(end - std::min(end, offset));
+    addData(fd, offset, Bytes(bytes.begin(), bytes.begin() + static_cast<std::ptrdiff_t>(written)));
+    return result;
+}
+
+int RecordingDisk::cloneData(int from, int to) {
+    const MutexLock lock(mutex_);
+    const int result = inner_.cloneData(from, to);
+    struct stat status = {};
+    if (result == 0 && ::fstat(from, &status) == 0)
+        addData(to, 0, readAt(from, 0, static_cast<std::size_t>(status.st_size)));
+    return result;
+}
+
+ssize_t RecordingDisk::copyData(int from, int to, std::size_t bytesMax) {
+    const MutexLock lock(mutex_);
+    const auto source = static_cast<std::uint64_t>(::lseek(from, 0, SEEK_CUR));
+    const std::uint64_t offset = writeOffset(to);
+    const ssize_t count = inner_.copyData(from, to, bytesMax);
+    if (count > 0)
+        addData(to, offset, readAt(from, source, static_cast<std::size_t>(count)));
+    return count;
+}
+
+int RecordingDisk::sync(int fd) {
+    const MutexLock lock(mutex_);
+    const int result = inner_.sync(fd);
+    const InodeId id = result == 0 ? find(fd) : 0;
+    if (id != 0)
+        add({.call = DiskCall::sync, .inode = id});
+    return result;
+}
+
+int RecordingDisk::syncFileSystem(int fd) {
+    const MutexLock lock(mutex_);
+    const int result = inner_.syncFileSystem(fd);
+    struct stat synced = {};
+    struct stat ours = {};
+    const bool same = ::fstat(fd, &synced) == 0 && ::stat(root_.c_str(), &ours) == 0 && synced.st_dev == ours.st_dev;
+    if (result == 0 && recording_ && same)
+        add({.call = DiskCall::syncFileSystem});
+    return result;
+}
+
+int RecordingDisk::orderData(int fd) {
+    const MutexLock lock(mutex_);
+    const int result = inner_.orderData(fd);
+    const InodeId id = result == 0 ? find(fd) : 0;
+    if (id != 0)
+        add({.call = DiskCall::orderData, .inode = id});
+    return result;
+}
+
+} // namespace zor::support

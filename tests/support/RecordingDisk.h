@@ -1,0 +1,115 @@
+// SPDX-License-Identifier: Apache-2.0
+// A Disk over a real directory tree that keeps a log of what each successful call did, in terms of inodes.
+//
+// The log and the tree at its start are all that PowerCut needs. The recorder keeps the tree in memory too: at the end
+// it must equal the one on disk, so a call that changes the disk without going through Disk is found as well. What lies
+// outside the tree or below an excluded path (sockets, logs, the run directory) passes through unrecorded. Calls are
+// made one at a time, so that the log's order is the disk's. Any thread.
+#pragma once
+
+#include "platform/Disk.h"
+#include "platform/Mutex.h"
+#include "support/DiskCall.h"
+#include "support/FileTree.h"
+
+#include <optional>
+
+namespace zor::support {
+
+/// A write that fails after some bytes is logged with those; cloneData and copyData are logged as writes of what they
+/// brought. setTimes and setInodeFlags are not modelled and not logged.
+struct LoggedOperation {
+    DiskCall call = DiskCall::sync;
+    /// Made, linked, moved, removed, changed, written or synced; 0 for syncFileSystem.
+    InodeId inode = 0;
+    /// Where its name is, or was before a rename.
+    InodeId directory = 0;
+    std::string name;
+    /// A rename's destination.
+    InodeId toDirectory = 0;
+    std::string toName;
+    /// What a rename replaced or, when `exchange`, moved the other way.
+    InodeId replaced = 0;
+    bool exchange = false;
+    /// The state given to a new inode; the mode or the owner that a change sets; the bytes of a write.
+    Inode value;
+    std::uint64_t offset = 0;
+    std::string attribute;
+
+    [[nodiscard]] bool changesNames() const;
+    [[nodiscard]] bool makesInode() const;
+    [[nodiscard]] bool changesInode() const;
+    [[nodiscard]] bool writes() const { return call == DiskCall::write; }
+    /// Whether `id` is one of the inodes that this operation changes.
+    [[nodiscard]] bool touches(InodeId id) const;
+    [[nodiscard]] std::string describe() const;
+};
+
+struct DiskLog {
+    FileTree start;
+    std::vector<LoggedOperation> operations;
+    /// Each mark as the count of operations before it, ascending.
+    std::vector<std::size_t> marks;
+};
+
+/// Brings a tree that holds each inode of the operation from before to after it. An operation on names is taken as what
+/// the names stand for afterwards, so it can be applied where an earlier one was left out.
+void apply(const LoggedOperation& operation, FileTree& tree);
+
+class RecordingDisk final : public platform::Disk {
+public:
+    /// `excluded` are paths relative to `root`. Records nothing until start.
+    RecordingDisk(platform::Disk& inner, std::string root, std::set<std::string> excluded = {});
+
+    /// Takes the tree as it is now for durable, with an empty log.
+    void start();
+    /// Notes that what was done so far is acknowledged.
+    void mark();
+    [[nodiscard]] DiskLog log() const;
+    /// What speaks against the log: calls that could not be followed, and where the recorded tree and the one on disk
+    /// differ now. Empty when nothing does.
+    [[nodiscard]] std::string complaint() const;
+
+    int makeDirectory(int directory, const char* name, mode_t mode) override;
+    int createFile(int directory, const char* name, mode_t mode) override;
+    int makeSymbolicLink(const char* target, int directory, const char* name) override;
+    int makeHardLink(int fromDirectory, const char* from, int toDirectory, const char* to) override;
+    int makeFifo(int directory, const char* name, mode_t mode) override;
+    int rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) override;
+    int unlinkFile(int directory, const char* name) override;
+    int removeDirectory(int directory, const char* name) override;
+    int changeMode(int fd, mode_t mode) override;
+    int changeOwner(int fd, uid_t uid, gid_t gid) override;
+    int setTimes(int fd, const timespec& access, const timespec& modification) override;
+    int setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) override;
+    int setInodeFlags(int fd, int flags) override;
+    int write(int fd, std::span<const std::uint8_t> bytes) override;
+    int cloneData(int from, int to) override;
+    ssize_t copyData(int from, int to, std::size_t bytesMax) override;
+    int sync(int fd) override;
+    int syncFileSystem(int fd) override;
+    int orderData(int fd) override;
+
+private:
+    /// 0 when the inode is not recorded.
+    InodeId find(int fd) ZOR_REQUIRES(mutex_);
+    [[nodiscard]] InodeId findEntry(InodeId directory, const std::string& name) const ZOR_REQUIRES(mutex_);
+    void add(LoggedOperation operation) ZOR_REQUIRES(mutex_);
+    void addNew(DiskCall call, int directory, const char* name) ZOR_REQUIRES(mutex_);
+    void addRemoval(DiskCall call, int directory, const char* name) ZOR_REQUIRES(mutex_);
+    void addChange(DiskCall call, int fd) ZOR_REQUIRES(mutex_);
+    void addData(int to, std::uint64_t offset, Bytes bytes) ZOR_REQUIRES(mutex_);
+
+    platform::Disk& inner_;
+    const std::string root_;
+    const std::set<std::string> excluded_;
+    mutable platform::Mutex mutex_;
+    bool recording_ ZOR_GUARDED_BY(mutex_) = false;
+    std::map<DeviceInode, InodeId> known_ ZOR_GUARDED_BY(mutex_);
+    InodeId nextId_ ZOR_GUARDED_BY(mutex_) = 0;
+    FileTree current_ ZOR_GUARDED_BY(mutex_);
+    DiskLog log_ ZOR_GUARDED_BY(mutex_);
+    std::string complaint_ ZOR_GUARDED_BY(mutex_);
+};
+
+} // namespace zor::support
