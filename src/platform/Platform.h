@@ -1,0 +1,47 @@
+// SPDX-License-Identifier: Apache-2.0
+// The set of platform roles that one daemon runs on. Every member may be replaced, which is how a test makes a world of its
+// own over a temporary root, or hands in a disk that fails.
+#pragma once
+
+#include "platform/BootMarker.h"
+#include "platform/CrashAnnotation.h"
+#include "platform/DeviceLockState.h"
+#include "platform/Disk.h"
+#include "platform/FileProtectionClass.h"
+#include "platform/PeerIdentity.h"
+#include "platform/PlatformLog.h"
+#include "platform/Queries.h"
+#include "platform/RunLoop.h"
+#include "platform/SandboxUserState.h"
+#include "platform/ServiceListener.h"
+#include "platform/ServiceTransaction.h"
+#include "platform/UpcallPort.h"
+#include "platform/WorkQueue.h"
+
+namespace zor::platform {
+
+class SystemRoot;
+
+/// References to objects that outlive whoever holds this.
+struct Platform {
+    const SystemRoot& root;
+    Disk& disk;
+    PlatformLog& log;
+    InternalBuildQuery& internalBuild;
+    SystemVersionQuery& systemVersion;
+    PasswordDatabase& passwords;
+    DeviceLockState& lockState;
+    FileProtectionClass& protection;
+    SandboxUserState& sandbox;
+    CrashAnnotation& crash;
+    BootMarker& bootMarker;
+    ServiceTransactions& transactions;
+    WorkQueue& deathRowQueue;
+    WorkQueue& lockStateQueue;
+    RunLoop& runLoop;
+    PeerIdentity& peers;
+    ServiceListener& listener;
+    UpcallPort& upcallPort;
+};
+
+} // namespace zor::platform
