@@ -1,0 +1,57 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "daemon/CommandTable.h"
+
+#include "daemon/commands/Commands.h"
+#include "platform/EntitlementKeys.h"
+
+namespace zor {
+
+namespace {
+
+using ipc::Command;
+using platform::entitlementKeys::allowed;
+using platform::entitlementKeys::wipeContainer;
+
+constexpr std::string_view none = noEntitlementRequired;
+constexpr ReplyFlag now = ReplyFlag::dispatcherReplies;
+constexpr ReplyFlag later = ReplyFlag::handlerReplies;
+
+constexpr std::array<ZORCommandTableRow, ipc::commandCount> rows = {{
+    {Command::createOrLookupContainer, commands::createOrLookupContainer, none, now},
+    {Command::listContainers, commands::listContainers, allowed, now},
+    {Command::replaceContainer, commands::notServedYet, allowed, now},
+    {Command::stageContainersForDelete, commands::notServedYet, allowed, now},
+    {Command::deleteContainersOnDeathRow, commands::deleteContainersOnDeathRow, allowed, later},
+    {Command::setInfoValue, commands::notServedYet, allowed, now},
+    {Command::getInfoValue, commands::notServedYet, allowed, now},
+    {Command::getMetadata, commands::notServedYet, allowed, now},
+    {Command::recreateDefaultStructure, commands::notServedYet, allowed, now},
+    {Command::regenerateDirectoryUUID, commands::notServedYet, allowed, now},
+    {Command::deleteContainer, commands::notServedYet, allowed, now},
+    {Command::wipeEntitledPluginDataContainer, commands::notServedYet, wipeContainer, now},
+    {Command::wipeDataContainerContent, commands::notServedYet, allowed, now},
+    {Command::getGroupContainerPaths, commands::notServedYet, none, now},
+    {Command::getGroupContainerIdentifiers, commands::notServedYet, allowed, now},
+    {Command::getSystemContainerPath, commands::notServedYet, none, now},
+    {Command::getSystemGroupContainerPaths, commands::notServedYet, none, now},
+    {Command::getSystemGroupContainerPath, commands::notServedYet, none, now},
+    {Command::processEntitlements, commands::notServedYet, allowed, now},
+    {Command::setDataProtection, commands::notServedYetDeferred, allowed, later},
+    {Command::recreateDefaultStructure2, commands::notServedYet, allowed, now},
+    {Command::getDiskUsage, commands::notServedYet, allowed, now},
+    {Command::retryTest, commands::notServedYet, allowed, now},
+}};
+
+constexpr bool everyRowIsItsCommand() {
+    for (std::size_t i = 0; i < rows.size(); ++i)
+        if (static_cast<std::size_t>(rows[i].command) != i || rows[i].handler == nullptr)
+            return false;
+    return true;
+}
+static_assert(everyRowIsItsCommand());
+
+} // namespace
+
+const std::array<ZORCommandTableRow, ipc::commandCount> commandTable = rows;
+
+} // namespace zor

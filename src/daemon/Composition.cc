@@ -1,0 +1,58 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "daemon/Composition.h"
+
+namespace zor {
+
+Composition::Composition(platform::Platform platform, fs::Durability::Probe probe)
+    : platform_(platform), log_(platform.log),
+      refusals_([this](uid_t uid, std::uint64_t linesLeftOut) {
+          log_.write(logLevelNotice, "RefusalLimiter", "Left out %llu refusals of user %u",
+                     static_cast<unsigned long long>(linesLeftOut), uid);
+      }),
+      boundary_(log_, platform.internalBuild, platform.crash), users_(log_, platform.passwords), locks_(log_),
+      fileManager_(log_, platform.root, platform.disk, platform.protection), durability_(platform.disk, probe),
+      configuration_(log_, fileManager_, platform.passwords),
+      cache_(log_, fileManager_, configuration_, durability_, boundary_) {
+    log_.limitRefusals([this](std::uint32_t uid) { return refusals_.admit(uid); });
+}
+
+Composition::Late::Late(Composition& composition)
+    : entitlements(composition.log_, composition.fileManager_, composition.configuration_),
+      whitelist(ZORWhitelist::forSystem(composition.log_, composition.fileManager_)),
+      services{.log = composition.log_,
+               .boundary = composition.boundary_,
+               .locks = composition.locks_,
+               .fileManager = composition.fileManager_,
+               .durability = composition.durability_,
+               .configuration = composition.configuration_,
+               .cache = composition.cache_,
+               .entitlements = entitlements,
+               .whitelist = whitelist,
+               .internalBuild = composition.platform_.internalBuild,
+               .sandbox = composition.platform_.sandbox,
+               .deathRowQueue = composition.platform_.deathRowQueue,
+               .transactions = composition.platform_.transactions},
+      sharedClient(std::make_shared<ZORClientConnection>(
+          services, ZORClientConnection::Client{.bundleIdentifier = "com.veltra.zorvaned.internal",
+                                                .userId = 0,
+                                                .allowOtherIdLookup = true,
+                                                .entitledWipeIdentifiers = std::nullopt})),
+      dispatcher(composition.log_, composition.users_, services) {}
+
+Composition::Late& Composition::late() {
+    if (!late_)
+        late_.emplace(*this);
+    return *late_;
+}
+
+StoreServices& Composition::store() { return late().services; }
+
+Dispatcher& Composition::dispatcher() { return late().dispatcher; }
+
+const std::shared_ptr<ZORClientConnection>& Composition::sharedClientConnection() { return late().sharedClient; }
+
+ZOREntitlementMapping& Composition::entitlements() { return late().entitlements; }
+
+const ZORWhitelist& Composition::whitelist() { return late().whitelist; }
+
+} // namespace zor

@@ -1,0 +1,79 @@
+// SPDX-License-Identifier: Apache-2.0
+// The composition root: every service, made once and in the order of what it calls, over one platform and one system root.
+//
+// Nothing below this reaches for a process-wide object; what is shared is handed down by reference. So a second daemon, or a test
+// with its own root, can live in the same process. Destruction goes the other way round.
+#pragma once
+
+#include "daemon/Dispatcher.h"
+#include "daemon/ZORClientConnection.h"
+#include "daemon/base/Log.h"
+#include "daemon/base/UserIdentity.h"
+#include "daemon/base/ZORException.h"
+#include "daemon/base/ZORLocks.h"
+#include "entitlements/ZOREntitlementMapping.h"
+#include "entitlements/ZORWhitelist.h"
+#include "fs/Durability.h"
+#include "fs/ZORFileManager.h"
+#include "platform/Platform.h"
+#include "platform/RefusalLimiter.h"
+#include "store/StoreServices.h"
+#include "store/ZORContainerCache.h"
+#include "store/ZORGlobalConfiguration.h"
+
+#include <memory>
+#include <optional>
+
+namespace zor {
+
+class Composition {
+public:
+    /// `probe` says how a file system orders what is not synced; tests put their own in its place.
+    explicit Composition(platform::Platform platform,
+                         fs::Durability::Probe probe = fs::orderingOfFileSystem);
+    Composition(const Composition&) = delete;
+    Composition& operator=(const Composition&) = delete;
+
+    [[nodiscard]] const platform::Platform& platform() const { return platform_; }
+    [[nodiscard]] const Log& log() const { return log_; }
+    [[nodiscard]] ZORFileManager& defaultManager() { return fileManager_; }
+    [[nodiscard]] ZORGlobalConfiguration& configuration() { return configuration_; }
+
+    // Made when they are first asked for: reading the entitlement file belongs to the start of the work, after the log is
+    // open. Not before the log is; the first call is made by the thread that starts the daemon.
+    [[nodiscard]] StoreServices& store();
+    [[nodiscard]] Dispatcher& dispatcher();
+    /// The daemon's own client.
+    [[nodiscard]] const std::shared_ptr<ZORClientConnection>& sharedClientConnection();
+    [[nodiscard]] ZOREntitlementMapping& entitlements();
+    [[nodiscard]] ZORContainerCache& cache() { return cache_; }
+    [[nodiscard]] ZORLocks& locks() { return locks_; }
+    [[nodiscard]] const ZORWhitelist& whitelist();
+
+private:
+    struct Late;
+    Late& late();
+
+    platform::Platform platform_;
+    Log log_;
+    platform::RefusalLimiter refusals_;
+    ExceptionBoundary boundary_;
+    UserIdentity users_;
+    ZORLocks locks_;
+    ZORFileManager fileManager_;
+    fs::Durability durability_;
+    ZORGlobalConfiguration configuration_;
+    ZORContainerCache cache_;
+
+    struct Late {
+        explicit Late(Composition& composition);
+        ZOREntitlementMapping entitlements;
+        ZORWhitelist whitelist;
+        StoreServices services;
+        std::shared_ptr<ZORClientConnection> sharedClient;
+        Dispatcher dispatcher;
+    };
+    std::optional<Late> late_;
+};
+
+} // namespace zor

@@ -1,0 +1,130 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "daemon/Daemon.h"
+
+#include "platform/linux/Names.h"
+
+namespace zor {
+
+namespace {
+
+constexpr std::string_view serviceName = "com.veltra.zorvaned";
+
+struct LogSize {
+    unsigned fileCount;
+    std::size_t fileBytesMax;
+};
+constexpr LogSize internalLogSize{4, 262'144};
+constexpr LogSize logSize{1, 102'400};
+
+constexpr int lockStateUnlocked = 0;
+constexpr int lockStateLocked = 1;
+
+} // namespace
+
+int Daemon::run() {
+    const platform::Platform& platform = composition_.platform();
+    auto startUp = platform.transactions.hold();
+    openLog();
+    setUp();
+    followLockState();
+    evaluateLockState();
+    if (!startUpcallServer()) {
+        composition_.log().write(logLevelError, "main",
+                                 "Failed to initialize kernel upcall interface. THIS IS BAD! Exiting.");
+        return -1;
+    }
+    startUp.reset();
+    startListener();
+    if (options_.ready)
+        options_.ready();
+    platform.runLoop.run();
+    platform.listener.stop();
+    return 0;
+}
+
+void Daemon::openLog() {
+    const platform::Platform& platform = composition_.platform();
+    const FileURL file = composition_.configuration().logDirectory().appendingFile(platform::names::logFile);
+    if (!platform.log.open(serviceName, options_.logLevel))
+        platform.log.writeToSystemLog(logLevelError,
+                                      formatted("Failed to set up rotating logs at path %s", file.c_str()));
+    const LogSize size = platform.internalBuild.isInternalBuild() ? internalLogSize : logSize;
+    platform.log.enableDiskLogging(file.path(), size.fileCount, size.fileBytesMax);
+    if (composition_.log().writes(logLevelDebug))
+        composition_.log().write(logLevelDebug, "main", "zorvaned built at %s %s started", __DATE__, __TIME__);
+}
+
+void Daemon::setUp() {
+    const platform::Platform& platform = composition_.platform();
+    const Log& log = composition_.log();
+    const auto& client = composition_.sharedClientConnection();
+    const platform::BootMarker::State marker = platform.bootMarker.look();
+    if (marker.foreign)
+        log.write(logLevelError, "main", "Semaphore %s belongs to somebody else; it counts as absent",
+                  platform.bootMarker.name().c_str());
+    if (!marker.present) {
+        log.write(logLevelNotice, "main", "zorvaned performing first boot initialization");
+        client->rebootContainerManagerSetup();
+        if (const int failure = platform.bootMarker.make())
+            log.write(logLevelError, "set_first_boot_work_completed", "Failed to create semaphore %s: %s",
+                      platform.bootMarker.name().c_str(), errorText(failure));
+    }
+    client->containerManagerSetup();
+}
+
+void Daemon::followLockState() {
+    const platform::Platform& platform = composition_.platform();
+    const int status = platform.lockState.registerForChanges(platform.runLoop, [this] { evaluateLockState(); });
+    if (status != 0)
+        composition_.log().write(logLevelError, "main", "%s failed for %s: %d",
+                                 platform.lockState.registrationCallName(), platform.lockState.notificationName(),
+                                 status);
+}
+
+void Daemon::evaluateLockState() {
+    const platform::Platform& platform = composition_.platform();
+    const int state = platform.lockState.currentState();
+    if (composition_.log().writes(logLevelDebug))
+        composition_.log().write(logLevelDebug, "ostrandd_notification_callback", "LockState=%d", state);
+    if (state == lockStateLocked) {
+        if (lastLockState_ != lockStateLocked)
+            platform.lockStateQueue.suspend();
+        lastLockState_ = lockStateLocked;
+    } else if (state == lockStateUnlocked) {
+        if (lastLockState_ == lockStateLocked)
+            platform.lockStateQueue.resume();
+        lastLockState_ = lockStateUnlocked;
+    }
+}
+
+bool Daemon::startUpcallServer() {
+    const platform::Platform& platform = composition_.platform();
+    const Log& log = composition_.log();
+    constexpr const char* function = "ZORKernServerStart";
+    if (const int failure = platform.upcallPort.checkIn()) {
+        log.write(logLevelError, function, "%s: %s", platform.upcallPort.checkInCallName(), errorText(failure));
+        return false;
+    }
+    const bool serving = platform.upcallPort.serve(platform.runLoop, [&log](const platform::UpcallPacket& packet) {
+        if (log.writes(logLevelDebug))
+            log.write(logLevelDebug, "ZORKernServer", "Upcall of %zu bytes from pid %d is not served by this version",
+                      packet.bytes.size(), packet.senderPid.value_or(-1));
+        return std::vector<std::uint8_t>();
+    });
+    if (!serving)
+        log.write(logLevelError, function, "%s failed", platform.upcallPort.sourceCallName());
+    return serving;
+}
+
+void Daemon::startListener() {
+    const platform::Platform& platform = composition_.platform();
+    Dispatcher& dispatcher = composition_.dispatcher();
+    const bool listening =
+        platform.listener.resume([&dispatcher](platform::PeerConnection& connection, platform::ServiceEvent& event) {
+            dispatcher.ZORProcessIpsiEvent(connection, event);
+        });
+    if (!listening)
+        composition_.log().write(logLevelError, "main", "unable to start ipsi service!");
+}
+
+} // namespace zor

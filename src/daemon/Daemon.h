@@ -1,0 +1,44 @@
+// SPDX-License-Identifier: Apache-2.0
+// The daemon's life: start-up in its fixed order, the lock-state follower, and the run loop.
+//
+// Runs on the main thread. Before the listener is made, no client is served; the setup is alone with the disk. A stop during
+// start-up leaves what the setup's own steps leave, and the next launch begins anew.
+#pragma once
+
+#include "daemon/Composition.h"
+#include "platform/ServiceTransaction.h"
+
+#include <functional>
+
+namespace zor {
+
+class Daemon {
+public:
+    struct Options {
+        int logLevel = logLevelNotice;
+        /// Runs when clients can connect, before the run loop: tells the service manager, opens the status.
+        std::function<void()> ready;
+    };
+    Daemon(Composition& composition, Options options) : composition_(composition), options_(std::move(options)) {}
+    Daemon(const Daemon&) = delete;
+    Daemon& operator=(const Daemon&) = delete;
+
+    /// The whole life; returns the exit status: 0, or -1 when start-up cannot go on.
+    int run();
+
+    /// The steps of run before the first client is served; tests call them one by one.
+    void openLog();
+    void setUp();
+    void followLockState();
+    void evaluateLockState();
+
+private:
+    bool startUpcallServer();
+    void startListener();
+
+    Composition& composition_;
+    const Options options_;
+    int lastLockState_ = 3; // neither locked nor unlocked seen yet; main thread only
+};
+
+} // namespace zor

@@ -1,0 +1,121 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "daemon/Dispatcher.h"
+
+#include "platform/EntitlementKeys.h"
+
+namespace zor {
+
+namespace powers = platform::entitlementKeys;
+
+namespace {
+
+const std::string* identifierOf(const platform::Identity& identity) {
+    return identity.grant && identity.grant->identifier ? &*identity.grant->identifier : nullptr;
+}
+
+/// The strings of an array; anything else in it names nothing.
+std::vector<std::string> stringsIn(const plist::Array& array) {
+    std::vector<std::string> strings;
+    for (const plist::Value& element : array)
+        if (const std::string* text = element.asString())
+            strings.push_back(*text);
+    return strings;
+}
+
+} // namespace
+
+void Dispatcher::ZORProcessIpsiEvent(platform::PeerConnection& connection, platform::ServiceEvent& event) {
+    if (event.kind == platform::ServiceEvent::Kind::invalid)
+        return;
+    const Log::ClientScope provoked(connection.peer().kernelUserId());
+    if (serve(connection, event)) {
+        served_.fetch_add(1, std::memory_order_relaxed);
+    } else {
+        refused_.fetch_add(1, std::memory_order_relaxed);
+        connection.cancel();
+    }
+}
+
+bool Dispatcher::serve(platform::PeerConnection& connection, platform::ServiceEvent& event) {
+    ErrorCode error = ErrorCode::success;
+    const std::uint64_t command = event.request.unsignedInteger(ipc::keys::command).value_or(0);
+    if (command >= commandTable.size()) {
+        ZOR_LOG(log_, logLevelError, "Invalid command index: %lld", static_cast<long long>(command));
+        return false;
+    }
+    const ZORCommandTableRow& row = commandTable[command];
+    if (static_cast<std::uint64_t>(row.command) != command) {
+        ZOR_LOG(log_, logLevelError, "Invalid command at index %llu", static_cast<unsigned long long>(command));
+        return false;
+    }
+    const platform::Identity identity = connection.peer().identify(platform::Peer::Explain::no);
+    const auto client = checkEntitlementsAndInitClientObject(row, identity);
+    if (!client)
+        return false;
+    if (!event.reply) {
+        log_.write(logLevelError, "ZORProcessIpsiEvent", "Dictionary does not have reply context");
+        return false;
+    }
+    plist::Dictionary reply;
+    CommandContext context{.request = event.request,
+                           .reply = reply,
+                           .client = client,
+                           .channel = event.reply,
+                           .users = users_,
+                           .log = log_,
+                           .error = error};
+    row.handler(context);
+    if (row.replyFlag == ReplyFlag::dispatcherReplies) {
+        reply.set(ipc::keys::replyError, static_cast<std::uint64_t>(error));
+        event.reply->send(reply);
+    }
+    return true;
+}
+
+std::shared_ptr<ZORClientConnection>
+Dispatcher::checkEntitlementsAndInitClientObject(const ZORCommandTableRow& row, const platform::Identity& identity) {
+    const std::string* identifier = identifierOf(identity);
+    if (!identifier)
+        ZOR_LOG(log_, logLevelError, "Failed to copy signing ID for pid %d : %s", identity.pid,
+                identity.grant ? "its registry entry has none" : "no registry entry matches it");
+    const bool noneRequired = row.requiredEntitlement == noEntitlementRequired;
+    const plist::Dictionary* entitlements =
+        identity.grant && identity.grant->entitlements ? &*identity.grant->entitlements : nullptr;
+    if (!entitlements) {
+        if (!noneRequired)
+            sayMissingEntitlement(row, identity);
+        return nullptr;
+    }
+    const bool allowed = entitlements->isTrue(powers::allowed);
+    const bool otherIdLookup = allowed || entitlements->isTrue(powers::otherIdLookup);
+    bool admitted = noneRequired || allowed;
+    std::optional<std::vector<std::string>> wipeIdentifiers;
+    if (row.requiredEntitlement == powers::wipeContainer) {
+        if (const plist::Array* array = entitlements->array(powers::wipeContainer)) {
+            wipeIdentifiers = stringsIn(*array);
+            admitted = true;
+        } else {
+            ZOR_LOG(log_, logLevelError, "No entitled containers to wipe");
+        }
+    } else if (!admitted) {
+        admitted = entitlements->isTrue(row.requiredEntitlement);
+    }
+    if (!admitted) {
+        sayMissingEntitlement(row, identity);
+        return nullptr;
+    }
+    ZORClientConnection::Client client{.userId = identity.effectiveUserId,
+                                       .allowOtherIdLookup = otherIdLookup,
+                                       .entitledWipeIdentifiers = std::move(wipeIdentifiers)};
+    if (identifier)
+        client.bundleIdentifier = *identifier;
+    return std::make_shared<ZORClientConnection>(services_, std::move(client));
+}
+
+void Dispatcher::sayMissingEntitlement(const ZORCommandTableRow& row, const platform::Identity& identity) const {
+    log_.write(logLevelError, "checkEntitlementsAndInitClientObject",
+               "connection attempt from pid %d (%s) missing required entitlement: %s", identity.pid,
+               ZOR_SHOWN(identifierOf(identity)), row.requiredEntitlement.data());
+}
+
+} // namespace zor

@@ -1,0 +1,51 @@
+// SPDX-License-Identifier: Apache-2.0
+// The way of every message: is the command one, who sends it, may it be sent, then the handler and the reply.
+//
+// A message that is refused ends its connection without a reply. The dispatcher holds no lock and keeps nothing of a peer
+// between messages. Messages of one connection come one at a time, those of different ones in parallel.
+#pragma once
+
+#include "daemon/CommandTable.h"
+#include "daemon/base/UserIdentity.h"
+#include "platform/ServiceListener.h"
+#include "store/StoreServices.h"
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <optional>
+
+namespace zor {
+
+class Dispatcher {
+public:
+    Dispatcher(const Log& log, UserIdentity& users, StoreServices& services)
+        : log_(log), users_(users), services_(services) {}
+    Dispatcher(const Dispatcher&) = delete;
+    Dispatcher& operator=(const Dispatcher&) = delete;
+
+    /// The per-message handler.
+    void ZORProcessIpsiEvent(platform::PeerConnection& connection, platform::ServiceEvent& event);
+
+    /// Since the start, for the status.
+    struct Counts {
+        std::uint64_t served = 0;
+        std::uint64_t refused = 0;
+    };
+    [[nodiscard]] Counts counts() const { return {served_.load(), refused_.load()}; }
+
+private:
+    bool serve(platform::PeerConnection& connection, platform::ServiceEvent& event);
+    /// The client of an admitted message; nullptr (said, where it is to be said) when the message is refused.
+    std::shared_ptr<ZORClientConnection> checkEntitlementsAndInitClientObject(const ZORCommandTableRow& row,
+                                                                              const platform::Identity& identity);
+    void sayMissingEntitlement(const ZORCommandTableRow& row, const platform::Identity& identity) const;
+
+    const Log& log_;
+    UserIdentity& users_;
+    StoreServices& services_;
+    std::atomic<std::uint64_t> served_{0};
+    std::atomic<std::uint64_t> refused_{0};
+};
+
+} // namespace zor

@@ -1,0 +1,62 @@
+// SPDX-License-Identifier: Apache-2.0
+// Creating or finding a container, listing a class, emptying death row.
+#include "daemon/commands/Commands.h"
+#include "daemon/commands/Request.h"
+#include "ipc/Uuid.h"
+
+namespace zor::commands {
+
+namespace keys = ipc::keys;
+
+void createOrLookupContainer(CommandContext& context) {
+    const ContainerClass containerClass = classOf(context.request, keys::containerClass);
+    const auto user = userOf(context, keys::userId, containerClass);
+    if (!user)
+        return;
+    const auto found = context.client->createOrLookupContainerForUser(
+        *user, ownIdentifierByDefault(context), containerClass,
+        {.createIfNecessary = context.request.isTrue(keys::createIfNecessary),
+         .transient = context.request.isTrue(keys::transient)});
+    if (!found) {
+        context.error = found.error().replyCode();
+        return;
+    }
+    context.reply = plist::Dictionary{
+        {std::string(keys::replyUUID), ipc::uuidValue(found->uuid.bytes())},
+        {std::string(keys::replyExisted), found->existed},
+        {std::string(keys::replyPath), found->path},
+        {std::string(keys::replyIdentifier), found->record->identifier()},
+    };
+}
+
+void listContainers(CommandContext& context) {
+    const ContainerClass containerClass = classOf(context.request, keys::containerClass);
+    const auto user = userOf(context, keys::userId, containerClass);
+    if (!user)
+        return;
+    const auto listed =
+        context.client->containersForUser(*user, containerClass, context.request.isTrue(keys::transient));
+    if (!listed) {
+        context.error = listed.error().replyCode();
+        return;
+    }
+    plist::Array identifiers;
+    plist::Array uuids;
+    identifiers.reserve(listed->size());
+    uuids.reserve(listed->size());
+    for (const auto& container : *listed) {
+        identifiers.emplace_back(container.identifier);
+        uuids.push_back(ipc::uuidValue(container.uuid.bytes()));
+    }
+    context.reply.set(keys::replyIdsArray, std::move(identifiers));
+    context.reply.set(keys::replyUUIDsArray, std::move(uuids));
+}
+
+void deleteContainersOnDeathRow(CommandContext& context) {
+    context.client->deleteContainersOnDeathRowWithCompletion(
+        [channel = context.channel](ErrorCode code) {
+            channel->send({{std::string(keys::replyError), static_cast<std::uint64_t>(code)}});
+        });
+}
+
+} // namespace zor::commands
