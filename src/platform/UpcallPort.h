@@ -5,6 +5,7 @@
 #include "platform/PeerIdentity.h"
 #include "platform/RunLoop.h"
 
+#include <cstddef>
 #include <cstdint>
 #include <functional>
 #include <optional>
@@ -31,6 +32,8 @@ public:
     /// `sourceCallName` then names the call.
     virtual bool serve(RunLoop& loop, std::function<std::vector<std::uint8_t>(const UpcallPacket&)> handler) = 0;
     [[nodiscard]] virtual const char* sourceCallName() const = 0;
+    /// The longest reply packet that the port can send; known once it is checked in. A longer one is dropped.
+    [[nodiscard]] virtual std::size_t replyBytesMax() const { return std::size_t{1} << 20; }
 };
 
 } // namespace zor::platform

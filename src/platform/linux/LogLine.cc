@@ -1,6 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/linux/LogLine.h"
 
+#include "plist/Utf8.h"
+
+#include <algorithm>
 #include <cstdio>
 
 namespace zor::platform {
@@ -14,43 +17,9 @@ unsigned char byteAt(std::string_view text, std::size_t position) {
     return static_cast<unsigned char>(text[position]);
 }
 
-/// How long the well-formed UTF-8 sequence at `position` is; 0 where there is none.
-std::size_t sequenceBytes(std::string_view text, std::size_t position) {
-    const unsigned char first = byteAt(text, position);
-    std::size_t count = 0;
-    // The second byte's range keeps out overlong forms, surrogates and what lies above U+10FFFF.
-    unsigned char secondLow = 0x80;
-    unsigned char secondHigh = 0xBF;
-    if (first < 0x80)
-        return 1;
-    if (first >= 0xC2 && first <= 0xDF) {
-        count = 2;
-    } else if (first >= 0xE0 && first <= 0xEF) {
-        count = 3;
-        secondLow = first == 0xE0 ? 0xA0 : 0x80;
-        secondHigh = first == 0xED ? 0x9F : 0xBF;
-    } else if (first >= 0xF0 && first <= 0xF4) {
-        count = 4;
-        secondLow = first == 0xF0 ? 0x90 : 0x80;
-        secondHigh = first == 0xF4 ? 0x8F : 0xBF;
-    }
-    if (count == 0 || text.size() - position < count)
-        return 0;
-    if (byteAt(text, position + 1) < secondLow || byteAt(text, position + 1) > secondHigh)
-        return 0;
-    for (std::size_t i = 2; i < count; ++i) {
-        if ((byteAt(text, position + i) & 0xC0) != 0x80)
-            return 0;
-    }
-    return count;
-}
-
 /// U+0080 to U+009F steer terminals like the ones below U+0020 do.
-bool isControl(std::string_view text, std::size_t position, std::size_t bytes) {
-    const unsigned char first = byteAt(text, position);
-    if (bytes == 1)
-        return (first < 0x20 && first != '\t') || first == 0x7F;
-    return bytes == 2 && first == 0xC2 && byteAt(text, position + 1) < 0xA0;
+bool isControl(char32_t character) {
+    return (character < 0x20 && character != '\t') || (character >= 0x7F && character < 0xA0);
 }
 
 void appendHex(std::string& line, unsigned char byte) {
@@ -63,13 +32,13 @@ void appendHex(std::string& line, unsigned char byte) {
 
 void appendEscaped(std::string& line, std::string_view text) {
     for (std::size_t i = 0; i < text.size();) {
-        const std::size_t bytes = sequenceBytes(text, i);
-        if (bytes > 0 && !isControl(text, i, bytes)) {
-            line.append(text, i, bytes);
-            i += bytes;
+        const plist::Utf8Character character = plist::decodeUtf8(text.substr(i));
+        if (character.length > 0 && !isControl(character.codePoint)) {
+            line.append(text, i, character.length);
+            i += character.length;
             continue;
         }
-        const std::size_t end = i + (bytes == 0 ? 1 : bytes);
+        const std::size_t end = i + std::max<std::size_t>(character.length, 1);
         for (; i < end; ++i) {
             if (text[i] == '\n')
                 line += "\\n";

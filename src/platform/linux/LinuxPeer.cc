@@ -1,0 +1,120 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "platform/linux/LinuxPeer.h"
+
+#include "platform/linux/CgroupUnit.h"
+#include "platform/linux/SmallFile.h"
+
+#include <cerrno>
+#include <climits>
+#include <cstring>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+namespace zor::platform {
+
+namespace {
+
+constexpr std::size_t cgroupBytesMax = 64 * 1024;
+constexpr const char* executableLink = "exe";
+
+std::string whyUnexamined(int error) {
+    if (error == ESRCH || error == ENOENT || error == EBADF)
+        return "the process has ended";
+    return std::string("the executable cannot be examined: ") + ::strerrordesc_np(error);
+}
+
+} // namespace
+
+Identity LinuxPeer::identify(Explain explain) {
+    registry_.lookIfDue();
+    Identity identity{
+        .pid = accepted_.pid, .effectiveUserId = accepted_.reportedUserId, .grant = nullptr, .explanation = {}};
+    const auto now = executable();
+    if (!now) {
+        judgedGeneration_ = 0;
+        judgedGrant_ = nullptr;
+        if (explain == Explain::yes)
+            identity.explanation = whyUnexamined(now.error());
+        return identity;
+    }
+    if (explain == Explain::no && *now == judgedExecutable_ && registry_.generation() == judgedGeneration_) {
+        identity.grant = judgedGrant_;
+        return identity;
+    }
+    registry_.takeNotices();
+    auto snapshot = registry_.snapshot();
+    Judgement judgement = judge(*snapshot, *now);
+    if (!judgement.named && registry_.lookAgain()) {
+        snapshot = registry_.snapshot();
+        judgement = judge(*snapshot, *now);
+    }
+    judgedExecutable_ = *now;
+    judgedGeneration_ = snapshot->generation;
+    judgedGrant_ = judgement.grant;
+    identity.grant = std::move(judgement.grant);
+    if (explain == Explain::yes)
+        identity.explanation = std::move(judgement.explanation);
+    return identity;
+}
+
+std::expected<FileId, int> LinuxPeer::executable() const {
+    struct stat status{};
+    // The link is one of the kernel's: following it leads to the file that runs, whatever its name is or was.
+    if (::fstatat(accepted_.process.get(), executableLink, &status, 0) != 0)
+        return std::unexpected(errno);
+    return FileId{.device = status.st_dev, .inode = status.st_ino};
+}
+
+LinuxPeer::Judgement LinuxPeer::judge(const IdentityRegistry::Snapshot& snapshot, const FileId& executable) const {
+    Judgement judgement;
+    for (const IdentityRegistry::Registered& registered : snapshot.entries) {
+        if (registered.executable != executable)
+            continue;
+        // Inode numbers are used again: what the path names is looked at once more before power is given.
+        if (IdentityRegistry::executableAt(registered.entry->executable) != executable)
+            continue;
+        judgement.named = true;
+        const std::string reason = mismatch(*registered.entry);
+        judgement.explanation += (judgement.explanation.empty() ? "" : "; ") + registered.fileName + ": " +
+                                 (reason.empty() ? "matches" : reason);
+        if (reason.empty()) {
+            judgement.grant = registered.entry->grant;
+            return judgement;
+        }
+    }
+    if (!judgement.named)
+        judgement.explanation = "no entry names " + executableName();
+    return judgement;
+}
+
+std::string LinuxPeer::mismatch(const RegistryEntry& entry) const {
+    if (!entry.admitsUser(accepted_.reportedUserId))
+        return "uid " + std::to_string(accepted_.reportedUserId) +
+               (entry.userIds ? " is not one of its UserIDs" : " is not 0, and it names no UserIDs");
+    if (entry.unit) {
+        if (const std::string actual = unit(); actual != *entry.unit)
+            return "the process is in unit \"" + actual + "\", not in \"" + *entry.unit + "\"";
+    }
+    if (entry.securityLabel && !accepted_.securityLabel)
+        return "the kernel gives no security label";
+    if (entry.securityLabel && entry.securityLabel != accepted_.securityLabel)
+        return "the security label is \"" + *accepted_.securityLabel + "\"";
+    return {};
+}
+
+std::string LinuxPeer::unit() const {
+    const FileDescriptor file(::openat(accepted_.process.get(), "cgroup", O_RDONLY | O_CLOEXEC));
+    if (!file.valid())
+        return {};
+    const auto text = readSmallFile(file.get(), cgroupBytesMax);
+    return text ? systemUnitInCgroups(*text) : std::string();
+}
+
+std::string LinuxPeer::executableName() const {
+    char buffer[PATH_MAX];
+    const ssize_t bytes = ::readlinkat(accepted_.process.get(), executableLink, buffer, sizeof buffer);
+    return bytes > 0 ? std::string(buffer, static_cast<std::size_t>(bytes)) : std::string("the executable");
+}
+
+} // namespace zor::platform

@@ -1,0 +1,98 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "platform/linux/LinuxPeerIdentity.h"
+
+#include "platform/linux/LinuxPeer.h"
+
+#include <cerrno>
+#include <fcntl.h>
+#include <poll.h>
+#include <string>
+#include <sys/socket.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+namespace zor::platform {
+
+namespace {
+
+#ifdef SO_PEERPIDFD
+constexpr int peerPidfdOption = SO_PEERPIDFD;
+#else
+constexpr int peerPidfdOption = 77;
+#endif
+constexpr std::size_t labelBytesMax = 4096;
+
+/// A descriptor of the process that connected. Kernels before 6.5 do not keep one with the socket: there the process
+/// that has the pid now is taken. Should the pid have been given to another one in the moment since the connect, that
+/// one is judged by its executable, but still under the uid that the kernel recorded.
+FileDescriptor processOfPeer(int socket, pid_t pid) {
+    int fd = -1;
+    socklen_t length = sizeof fd;
+    if (::getsockopt(socket, SOL_SOCKET, peerPidfdOption, &fd, &length) == 0)
+        return FileDescriptor(fd);
+    if (errno != ENOPROTOOPT)
+        return {};
+    return FileDescriptor(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)));
+}
+
+bool hasEnded(int pidfd) {
+    pollfd ended{.fd = pidfd, .events = POLLIN, .revents = 0};
+    int count = 0;
+    do {
+        count = ::poll(&ended, 1, 0);
+    } while (count < 0 && errno == EINTR);
+    return count != 0;
+}
+
+/// /proc/PID of the peer. It was the peer's when it was opened if the peer was alive afterwards; from then on the
+/// descriptor belongs to that process alone.
+FileDescriptor pinProcess(int socket, pid_t pid) {
+    const FileDescriptor process = processOfPeer(socket, pid);
+    if (!process.valid())
+        return {};
+    const std::string path = "/proc/" + std::to_string(pid);
+    FileDescriptor directory(::open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    if (hasEnded(process.get()))
+        directory.reset();
+    return directory;
+}
+
+std::optional<std::string> securityLabelOf(int socket) {
+    std::string label(256, '\0');
+    for (;;) {
+        auto length = static_cast<socklen_t>(label.size());
+        if (::getsockopt(socket, SOL_SOCKET, SO_PEERSEC, label.data(), &length) == 0) {
+            label.resize(length);
+            break;
+        }
+        if (errno != ERANGE || length <= label.size() || length > labelBytesMax)
+            return std::nullopt;
+        label.resize(length);
+    }
+    while (!label.empty() && (label.back() == '\0' || label.back() == '\n'))
+        label.pop_back();
+    if (label.empty())
+        return std::nullopt;
+    return label;
+}
+
+} // namespace
+
+std::unique_ptr<Peer> LinuxPeerIdentity::peerOfSocket(int socket) {
+    ucred credentials{};
+    socklen_t length = sizeof credentials;
+    if (::getsockopt(socket, SOL_SOCKET, SO_PEERCRED, &credentials, &length) != 0)
+        return nullptr;
+    // 0 is a process that has no pid here: one outside of this pid namespace.
+    if (credentials.pid <= 0 || credentials.uid == static_cast<uid_t>(-1))
+        return nullptr;
+    const bool isOwner = daemonUserId_ != 0 && ownsRoot(credentials.uid);
+    return std::make_unique<LinuxPeer>(LinuxPeer::Accepted{.pid = credentials.pid,
+                                                           .uid = credentials.uid,
+                                                           .reportedUserId = isOwner ? 0 : credentials.uid,
+                                                           .process = pinProcess(socket, credentials.pid),
+                                                           .securityLabel = securityLabelOf(socket)},
+                                       registry_);
+}
+
+} // namespace zor::platform
