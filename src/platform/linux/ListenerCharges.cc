@@ -1,0 +1,93 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "platform/linux/ListenerCharges.h"
+
+#include <cstdio>
+#include <cstdlib>
+
+namespace zor::platform {
+
+namespace {
+
+void mustHold(bool condition, const char* what) {
+    if (!condition) {
+        std::fprintf(stderr, "listener charges: %s\n", what);
+        std::abort();
+    }
+}
+
+} // namespace
+
+ListenerCharges::~ListenerCharges() {
+    const MutexLock lock(mutex_);
+    mustHold(accounts_.empty(), "an account is still open");
+    mustHold(totals_.connections == 0, "connections do not balance");
+    mustHold(totals_.inputBytes == 0, "input bytes do not balance");
+    mustHold(totals_.outputBytes == 0, "output bytes do not balance");
+    mustHold(connectionsOfOthers_ == 0, "connections of others do not balance");
+}
+
+ListenerCharges::Account* ListenerCharges::openConnection(uid_t uid, bool ownsRoot) {
+    const MutexLock lock(mutex_);
+    if (totals_.connections >= limits_.connectionsMax)
+        return nullptr;
+    const std::size_t kept = limits_.connectionsKeptForOwners;
+    const auto found = accounts_.find(uid);
+    if (!ownsRoot) {
+        if (connectionsOfOthers_ + kept >= limits_.connectionsMax)
+            return nullptr;
+        if (found != accounts_.end() && found->second.connections >= limits_.connectionsMaxPerUser)
+            return nullptr;
+        ++connectionsOfOthers_;
+    }
+    Account& account = found != accounts_.end() ? found->second : accounts_[uid];
+    account.uid = uid;
+    account.ownsRoot = ownsRoot;
+    ++account.connections;
+    ++totals_.connections;
+    return &account;
+}
+
+void ListenerCharges::closeConnection(Account& account) {
+    const MutexLock lock(mutex_);
+    mustHold(account.connections > 0, "a connection is closed twice");
+    mustHold(totals_.connections >= account.connections, "a user has more connections than there are");
+    if (!account.ownsRoot)
+        --connectionsOfOthers_;
+    --totals_.connections;
+    if (--account.connections > 0)
+        return;
+    mustHold(account.inputBytes == 0, "a user's input bytes do not balance");
+    mustHold(account.outputBytes == 0, "a user's output bytes do not balance");
+    accounts_.erase(account.uid);
+}
+
+bool ListenerCharges::changeInput(Account& account, std::size_t before, std::size_t after) {
+    const MutexLock lock(mutex_);
+    mustHold(account.inputBytes >= before, "more input bytes are given back than were taken");
+    const std::size_t ofUser = account.inputBytes - before + after;
+    const std::size_t inAll = totals_.inputBytes - before + after;
+    const bool tooMuch = inAll > limits_.inputBytesMax || (!account.ownsRoot && ofUser > limits_.inputBytesMaxPerUser);
+    if (after > before && tooMuch)
+        return false;
+    account.inputBytes = ofUser;
+    totals_.inputBytes = inAll;
+    return true;
+}
+
+bool ListenerCharges::changeOutput(Account& account, std::size_t before, std::size_t after) {
+    const MutexLock lock(mutex_);
+    mustHold(account.outputBytes >= before, "more output bytes are given back than were taken");
+    const std::size_t ofUser = account.outputBytes - before + after;
+    if (after > before && !account.ownsRoot && ofUser > limits_.outputBytesMaxPerUser)
+        return false;
+    account.outputBytes = ofUser;
+    totals_.outputBytes = totals_.outputBytes - before + after;
+    return true;
+}
+
+ListenerCharges::Totals ListenerCharges::totals() const {
+    const MutexLock lock(mutex_);
+    return totals_;
+}
+
+} // namespace zor::platform

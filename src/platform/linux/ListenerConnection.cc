@@ -1,0 +1,268 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "platform/linux/ListenerConnection.h"
+
+#include "ipc/Frame.h"
+#include "platform/linux/ListenerCore.h"
+#include "plist/Binary.h"
+
+#include <sys/epoll.h>
+#include <sys/socket.h>
+#include <utility>
+
+namespace zor::platform {
+
+namespace {
+
+/// A reply is written into a buffer that its thread keeps, unless it has become larger than most replies ever are.
+constexpr std::size_t replyBufferBytesKept = std::size_t{256} * 1024;
+
+} // namespace
+
+/// The fields below the connection are guarded by the connection's mutex.
+class ListenerConnection::Channel final : public ReplyChannel {
+public:
+    explicit Channel(std::shared_ptr<ListenerConnection> owner) : connection(std::move(owner)) {}
+
+    void send(const plist::Dictionary& reply) override {
+        thread_local plist::Data frame;
+        frame.resize(ipc::frameHeaderBytes);
+        if (plist::appendBinary(reply, frame) && frame.size() - ipc::frameHeaderBytes <= ipc::replyPayloadBytesMax)
+            connection->transmit(*this, frame);
+        else
+            connection->unwritable(*this);
+        if (frame.capacity() > replyBufferBytesKept)
+            plist::Data().swap(frame);
+    }
+
+    const std::shared_ptr<ListenerConnection> connection;
+    std::uint64_t life = 0;
+    std::uint64_t id = 0;
+    bool sent = true;
+};
+
+void ListenerConnection::open(FileDescriptor socket, std::unique_ptr<Peer> peer, ListenerCharges::Account& account) {
+    bool added = false;
+    {
+        // Under the mutex to the end: an event that belongs to an earlier life may come at any moment.
+        const MutexLock lock(mutex_);
+        input_.open(core_.charges, account, peer->pid());
+        output_.open(core_.charges, account, core_.limits.outputBytesMax);
+        account_ = &account;
+        peer_ = std::move(peer);
+        descriptor_ = socket.get();
+        socket_ = std::move(socket);
+        over_ = false;
+        open_ = true;
+        ++life_;
+        added = core_.pool.add(descriptor_, *this, EPOLLIN);
+        held_ = !added;
+    }
+    if (!added)
+        close();
+}
+
+void ListenerConnection::endAfterStop() {
+    {
+        const MutexLock lock(mutex_);
+        if (!open_)
+            return;
+        held_ = true;
+        over_ = true;
+    }
+    close();
+}
+
+void ListenerConnection::run(ListenerScratch& scratch, std::uint32_t events) {
+    {
+        const MutexLock lock(mutex_);
+        // Out of date, or another worker has it and will arm it again: nothing is lost, arming reports what is there.
+        if (!open_ || (events != 0 && held_))
+            return;
+        held_ = true;
+        if (output_.pendingBytes() > 0 && output_.flush(descriptor_) == ListenerOutput::Result::broken)
+            dropLocked();
+    }
+    finish(serve(scratch));
+}
+
+ListenerConnection::Outcome ListenerConnection::serve(ListenerScratch& scratch) {
+    unsigned framesLeft = core_.limits.framesPerTurn;
+    for (;;) {
+        if (const std::optional<Outcome> outcome = serveArrived(scratch, framesLeft))
+            return *outcome;
+        if (output_.pendingBytes() >= core_.limits.outputBytesPaused)
+            return Outcome::wait;
+        switch (input_.receive(descriptor_, scratch)) {
+        case ListenerInput::Received::bytes:
+            break;
+        case ListenerInput::Received::nothing:
+            return Outcome::wait;
+        case ListenerInput::Received::ended:
+            return Outcome::end;
+        case ListenerInput::Received::foreign:
+            return endWithOther(ListenerIncident::foreignSender);
+        case ListenerInput::Received::tooMuch:
+            return endWithIncident(ListenerIncident::tooMuchInput, static_cast<std::int64_t>(peer_->kernelUserId()));
+        }
+        if (input_.filled())
+            continue;
+        // Probably that was all; if not, arming says so at once, after others have had their turn.
+        return serveArrived(scratch, framesLeft).value_or(Outcome::wait);
+    }
+}
+
+std::optional<ListenerConnection::Outcome> ListenerConnection::serveArrived(ListenerScratch& scratch,
+                                                                            unsigned& framesLeft) {
+    for (;;) {
+        if (over_)
+            return Outcome::end;
+        const std::span<const std::uint8_t> pending = input_.pending();
+        if (pending.size() < ipc::frameHeaderBytes)
+            return std::nullopt;
+        const ipc::FrameHeader header = ipc::decodeFrameHeader(pending.first<ipc::frameHeaderBytes>());
+        if (!header.isValidRequest())
+            return endWithOther(ListenerIncident::brokenFrame);
+        if (pending.size() - ipc::frameHeaderBytes < header.payloadBytes)
+            return std::nullopt;
+        if (output_.pendingBytes() >= core_.limits.outputBytesPaused)
+            return Outcome::wait;
+        if (framesLeft == 0)
+            return Outcome::requeue;
+        --framesLeft;
+        if (!serveFrame(header, pending.subspan(ipc::frameHeaderBytes, header.payloadBytes)))
+            return endWithOther(ListenerIncident::brokenFrame);
+        input_.consume(ipc::frameHeaderBytes + header.payloadBytes);
+        scratch.messages.store(scratch.messages.load(std::memory_order_relaxed) + 1, std::memory_order_relaxed);
+    }
+}
+
+bool ListenerConnection::serveFrame(const ipc::FrameHeader& header, std::span<const std::uint8_t> payload) {
+    auto value = plist::readBinary(payload);
+    plist::Dictionary* request = value ? value->asMutableDictionary() : nullptr;
+    if (!request)
+        return false;
+    ServiceEvent event = {.kind = ServiceEvent::Kind::message, .request = std::move(*request), .reply = nullptr};
+    if (header.expectsReply())
+        event.reply = channelFor(header.id);
+    core_.handler(*this, event);
+    return true;
+}
+
+ListenerConnection::Outcome ListenerConnection::endWithOther(ListenerIncident incident) {
+    core_.incidents.happened(incident, peer_->pid());
+    ServiceEvent event = {.kind = ServiceEvent::Kind::other, .request = {}, .reply = nullptr};
+    core_.handler(*this, event);
+    return Outcome::end;
+}
+
+ListenerConnection::Outcome ListenerConnection::endWithIncident(ListenerIncident incident, std::int64_t about) {
+    core_.incidents.happened(incident, about);
+    return Outcome::end;
+}
+
+std::shared_ptr<ListenerConnection::Channel> ListenerConnection::channelFor(std::uint64_t id) {
+    // Counted once, it is ours alone. Another thread that had it may have dropped it just now, after a send under the
+    // mutex.
+    if (!channel_ || channel_.use_count() != 1)
+        channel_ = std::make_shared<Channel>(shared_from_this());
+    const MutexLock lock(mutex_);
+    channel_->life = life_;
+    channel_->id = id;
+    channel_->sent = false;
+    return channel_;
+}
+
+std::uint32_t ListenerConnection::eventsWanted() const {
+    const std::size_t pending = output_.pendingBytes();
+    if (pending == 0)
+        return EPOLLIN;
+    return pending < core_.limits.outputBytesPaused ? std::uint32_t{EPOLLIN | EPOLLOUT} : std::uint32_t{EPOLLOUT};
+}
+
+void ListenerConnection::finish(Outcome outcome) {
+    if (outcome != Outcome::end && !input_.keep())
+        outcome = endWithIncident(ListenerIncident::tooMuchInput, static_cast<std::int64_t>(peer_->kernelUserId()));
+    if (outcome == Outcome::requeue)
+        return core_.pool.requeue(*this);
+    if (outcome == Outcome::wait) {
+        const MutexLock lock(mutex_);
+        held_ = false;
+        if (!over_ && core_.pool.rearm(descriptor_, *this, eventsWanted()))
+            return;
+        held_ = true;
+    }
+    close();
+}
+
+void ListenerConnection::close() {
+    {
+        const MutexLock lock(mutex_);
+        over_ = true;
+    }
+    ServiceEvent event = {.kind = ServiceEvent::Kind::invalid, .request = {}, .reply = nullptr};
+    core_.handler(*this, event);
+
+    ListenerCharges::Account* account = nullptr;
+    input_.close();
+    channel_.reset();
+    peer_.reset();
+    {
+        const MutexLock lock(mutex_);
+        output_.close();
+        core_.pool.remove(descriptor_);
+        socket_.reset();
+        descriptor_ = -1;
+        account = std::exchange(account_, nullptr);
+        open_ = false;
+        held_ = false;
+    }
+    core_.charges.closeConnection(*account);
+    core_.recycle(*this);
+}
+
+void ListenerConnection::cancel() {
+    const MutexLock lock(mutex_);
+    over_ = true;
+}
+
+void ListenerConnection::transmit(Channel& channel, plist::Data& frame) {
+    const MutexLock lock(mutex_);
+    if (channel.sent || channel.life != life_ || !open_ || over_)
+        return;
+    channel.sent = true;
+    const ipc::FrameHeader header = {.payloadBytes = static_cast<std::uint32_t>(frame.size() - ipc::frameHeaderBytes),
+                                     .flags = ipc::frameIsReply,
+                                     .id = channel.id};
+    ipc::encodeFrameHeader(header, std::span(frame).first<ipc::frameHeaderBytes>());
+    switch (output_.write(socket_.get(), frame)) {
+    case ListenerOutput::Result::done:
+        return;
+    case ListenerOutput::Result::kept:
+        if (!held_ && !core_.pool.rearm(socket_.get(), *this, eventsWanted()))
+            dropLocked();
+        return;
+    case ListenerOutput::Result::tooMuch:
+        core_.incidents.happened(ListenerIncident::tooMuchOutput, static_cast<std::int64_t>(account_->uid));
+        return dropLocked();
+    case ListenerOutput::Result::broken:
+        return dropLocked();
+    }
+}
+
+void ListenerConnection::unwritable(Channel& channel) {
+    const MutexLock lock(mutex_);
+    if (channel.sent || channel.life != life_ || !open_ || over_)
+        return;
+    channel.sent = true;
+    core_.incidents.happened(ListenerIncident::unwritableReply, static_cast<std::int64_t>(account_->uid));
+    // A peer that waits for this reply has to learn that it does not come.
+    dropLocked();
+}
+
+void ListenerConnection::dropLocked() {
+    over_ = true;
+    output_.discard();
+    ::shutdown(socket_.get(), SHUT_RDWR);
+}
+
+} // namespace zor::platform

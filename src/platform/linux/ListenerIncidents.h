@@ -1,0 +1,57 @@
+// SPDX-License-Identifier: Apache-2.0
+// What goes wrong on connections, counted, and told to whoever keeps the log: of each kind at most one line a second,
+// so that clients cannot fill it. Any thread.
+#pragma once
+
+#include <array>
+#include <atomic>
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <string_view>
+#include <utility>
+
+namespace zor::platform {
+
+enum class ListenerIncident : std::uint8_t {
+    /// A connection was closed at once: the user, or the listener, has as many as it may.
+    tooManyConnections,
+    /// A connection was closed at once: the process is out of descriptors or memory.
+    outOfDescriptors,
+    /// The kernel does not say who connected.
+    unknownPeer,
+    /// Bytes came from another process than the one that connected.
+    foreignSender,
+    /// Something that is no request.
+    brokenFrame,
+    /// More of requests was buffered than the user may have buffered.
+    tooMuchInput,
+    /// A peer left more of its replies unread than is kept.
+    tooMuchOutput,
+    /// A reply that cannot be written: a fault of the daemon.
+    unwritableReply,
+};
+inline constexpr std::size_t listenerIncidentKinds = 8;
+
+/// Gets a line for the log. Any thread, one call at a time for each kind.
+using ListenerReport = std::function<void(std::string_view line)>;
+
+class ListenerIncidents {
+public:
+    explicit ListenerIncidents(ListenerReport report) : report_(std::move(report)) {}
+    /// `about` is the uid or the pid that the incident is about.
+    void happened(ListenerIncident incident, std::int64_t about);
+    [[nodiscard]] std::uint64_t count(ListenerIncident incident) const;
+
+private:
+    struct Kind {
+        std::atomic<std::uint64_t> count{0};
+        std::atomic<std::uint64_t> countTold{0};
+        /// Of the steady clock; the first second is 1.
+        std::atomic<std::int64_t> toldAtSeconds{0};
+    };
+    const ListenerReport report_;
+    std::array<Kind, listenerIncidentKinds> kinds_;
+};
+
+} // namespace zor::platform

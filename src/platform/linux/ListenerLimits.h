@@ -1,0 +1,54 @@
+// SPDX-License-Identifier: Apache-2.0
+// How much of the daemon clients may take up through their connections, and how the pool that serves them is sized.
+// Tests make these smaller; nothing else changes them.
+#pragma once
+
+#include "ipc/Limits.h"
+
+#include <chrono>
+#include <cstddef>
+
+namespace zor::platform {
+
+struct ListenerLimits {
+    /// Connections in all, and of any one user that does not own the root.
+    std::size_t connectionsMax = 4096;
+    std::size_t connectionsMaxPerUser = 1024;
+    /// Of connectionsMax, kept for the owners of the root: four users together cannot lock them out.
+    std::size_t connectionsKeptForOwners = 64;
+
+    /// Bytes of requests that have not arrived whole, in all and of any one user that does not own the root.
+    std::size_t inputBytesMax = std::size_t{256} << 20;
+    std::size_t inputBytesMaxPerUser = std::size_t{64} << 20;
+
+    /// A connection with this much reply unread is not read from: a peer that never reads cannot make the daemon work.
+    std::size_t outputBytesPaused = std::size_t{1} << 20;
+    /// With more unread than this a connection is dropped.
+    std::size_t outputBytesMax = std::size_t{64} << 20;
+    /// Unread replies of all connections of any one user that does not own the root.
+    std::size_t outputBytesMaxPerUser = std::size_t{256} << 20;
+
+    /// Requests of one connection that are served in a row before others have their turn.
+    unsigned framesPerTurn = 16;
+
+    /// Threads that run handlers at once; 0 means one for each processor, and no fewer than 2.
+    unsigned threadsRunning = 0;
+    /// Threads in all, those included that wait inside a handler.
+    unsigned threadsMax = 64;
+    /// A thread that is not needed ends after this time.
+    std::chrono::milliseconds threadIdle{5000};
+    /// How long a handler may wait unannounced before another thread takes its place.
+    std::chrono::milliseconds tick{10};
+};
+
+/// What one receive can take: most requests fit several times over.
+inline constexpr std::size_t listenerScratchBytes = 32 * 1024;
+/// Input up to this size is put together in the scratch buffer; beyond it the connection's own buffer takes the rest.
+inline constexpr std::size_t listenerSmallInputBytes = 4 * 1024;
+
+static_assert(listenerSmallInputBytes + ipc::frameHeaderBytes < listenerScratchBytes);
+// Requests that wait for their turn are kept too. They never fill a user's share, or fairness would drop connections.
+static_assert(ListenerLimits{}.connectionsMaxPerUser * listenerScratchBytes < ListenerLimits{}.inputBytesMaxPerUser);
+static_assert(ListenerLimits{}.outputBytesPaused < ListenerLimits{}.outputBytesMax);
+
+} // namespace zor::platform

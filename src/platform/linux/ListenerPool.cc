@@ -1,0 +1,385 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "platform/linux/ListenerPool.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <csignal>
+#include <cstdio>
+#include <cstring>
+#include <fcntl.h>
+#include <poll.h>
+#include <pthread.h>
+#include <string_view>
+#include <sys/epoll.h>
+#include <sys/eventfd.h>
+#include <system_error>
+#include <unistd.h>
+
+namespace zor::platform {
+
+namespace {
+
+constexpr std::uint64_t phaseMask = 3;
+constexpr std::uint64_t oneTask = 4;
+
+/// A thread that takes no signals: those belong to the main thread. False when the system gives none.
+bool startThreadWithoutSignals(std::thread& thread, const char* name, std::function<void()> body) {
+    sigset_t all;
+    sigset_t before;
+    sigfillset(&all);
+    pthread_sigmask(SIG_SETMASK, &all, &before);
+    bool started = true;
+    try {
+        thread = std::thread(std::move(body));
+        pthread_setname_np(thread.native_handle(), name);
+    } catch (const std::system_error&) {
+        started = false;
+    }
+    pthread_sigmask(SIG_SETMASK, &before, nullptr);
+    return started;
+}
+
+} // namespace
+
+ListenerPool::ListenerPool(const ListenerLimits& limits)
+    : running_(limits.threadsRunning > 0 ? limits.threadsRunning : std::max(2U, std::thread::hardware_concurrency())),
+      threadsMax_(std::max(limits.threadsMax, running_)), threadIdle_(limits.threadIdle), tick_(limits.tick) {}
+
+ListenerPool::~ListenerPool() {
+    stop();
+}
+
+bool ListenerPool::start() {
+    epoll_.reset(::epoll_create1(EPOLL_CLOEXEC));
+    wake_.reset(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
+    if (!epoll_.valid() || !wake_.valid())
+        return false;
+    // Edge-triggered, so that one write wakes one worker and nobody has to read it.
+    epoll_event event = {.events = EPOLLIN | EPOLLET, .data = {.ptr = nullptr}};
+    if (::epoll_ctl(epoll_.get(), EPOLL_CTL_ADD, wake_.get(), &event) != 0)
+        return false;
+    if (!startThreadWithoutSignals(watcher_, "listener-watch", [this] { watch(); }))
+        return false;
+    const MutexLock lock(mutex_);
+    while (addWorkerLocked()) {
+    }
+    return !workers_.empty();
+}
+
+void ListenerPool::stop() {
+    std::vector<std::unique_ptr<Worker>> workers;
+    {
+        const MutexLock lock(mutex_);
+        stopping_ = true;
+        workers.swap(workers_);
+        joinEnded();
+    }
+    parkedWake_.broadcast();
+    watcherWake_.broadcast();
+    if (wake_.valid())
+        wakeWaiting();
+    if (watcher_.joinable())
+        watcher_.join();
+    for (const auto& worker : workers)
+        worker->thread.join();
+    const MutexLock lock(mutex_);
+    for (const auto& worker : workers)
+        messagesOfEnded_ += worker->scratch.messages.load(std::memory_order_relaxed);
+    requeued_.clear();
+    requeuedCount_ = 0;
+    laterJob_ = nullptr;
+}
+
+bool ListenerPool::add(int fd, ListenerTask& task, std::uint32_t events) {
+    epoll_event event = {.events = events | EPOLLONESHOT, .data = {.ptr = &task}};
+    return ::epoll_ctl(epoll_.get(), EPOLL_CTL_ADD, fd, &event) == 0;
+}
+
+bool ListenerPool::rearm(int fd, ListenerTask& task, std::uint32_t events) {
+    epoll_event event = {.events = events | EPOLLONESHOT, .data = {.ptr = &task}};
+    return ::epoll_ctl(epoll_.get(), EPOLL_CTL_MOD, fd, &event) == 0;
+}
+
+void ListenerPool::remove(int fd) {
+    ::epoll_ctl(epoll_.get(), EPOLL_CTL_DEL, fd, nullptr);
+}
+
+void ListenerPool::requeue(ListenerTask& task) {
+    {
+        const MutexLock lock(mutex_);
+        requeued_.push_back(&task);
+        ++requeuedCount_;
+    }
+    if (waiting_ > 0)
+        wakeWaiting();
+}
+
+void ListenerPool::callLater(std::chrono::milliseconds delay, std::function<void()> job) {
+    {
+        const MutexLock lock(mutex_);
+        laterAt_ = Clock::now() + delay;
+        laterJob_ = std::move(job);
+    }
+    watcherWake_.signal();
+}
+
+ListenerPool::Counters ListenerPool::counters() const {
+    const MutexLock lock(mutex_);
+    Counters counters = {.threads = static_cast<unsigned>(workers_.size()),
+                         .threadsParked = parked_ - called_,
+                         .threadsMost = threadsMost_,
+                         .messages = messagesOfEnded_};
+    const unsigned active = active_;
+    counters.threadsBlocked = counters.threads - std::min(counters.threads, active + counters.threadsParked);
+    for (const auto& worker : workers_)
+        counters.messages += worker->scratch.messages.load(std::memory_order_relaxed);
+    return counters;
+}
+
+// Workers.
+
+void ListenerPool::work(Worker& worker) {
+    worker.threadId = ::gettid();
+    BlockingObserver::setForThisThread(&worker);
+    while (!stopping_) {
+        if (active_ > running_ && !parkWhileEnoughRun(worker))
+            return;
+        const Ready ready = nextReady(worker);
+        if (ready.task)
+            runTask(worker, ready);
+    }
+    // One write wakes one worker: the next one is this one's to wake.
+    wakeWaiting();
+}
+
+void ListenerPool::runTask(Worker& worker, const Ready& ready) {
+    const std::uint64_t task = (worker.state.load(std::memory_order_relaxed) & ~phaseMask) + oneTask;
+    worker.state.store(task | static_cast<std::uint64_t>(Phase::working));
+    ready.task->run(worker.scratch, ready.events);
+    const std::uint64_t last = worker.state.exchange(task | static_cast<std::uint64_t>(Phase::waiting));
+    if (last == (task | static_cast<std::uint64_t>(Phase::blocked)))
+        ++active_;
+}
+
+ListenerPool::Ready ListenerPool::nextReady(Worker& worker) {
+    // Descriptors and requeued tasks take turns.
+    if (worker.requeuedFirst && requeuedCount_ > 0) {
+        worker.requeuedFirst = false;
+        if (ListenerTask* task = takeRequeued())
+            return {.task = task};
+    }
+    epoll_event event = {};
+    ++waiting_;
+    // Looked at after this worker counts as waiting: either it sees a requeued task, or who requeues it wakes this one.
+    const int timeout = requeuedCount_ > 0 ? 0 : -1;
+    const int count = ::epoll_wait(epoll_.get(), &event, 1, timeout);
+    if (waiting_-- == 1)
+        nobodyWaits();
+    if (count != 1 || event.data.ptr == nullptr)
+        return {.task = takeRequeued()};
+    worker.requeuedFirst = true;
+    return {.task = static_cast<ListenerTask*>(event.data.ptr), .events = event.events};
+}
+
+ListenerTask* ListenerPool::takeRequeued() {
+    if (requeuedCount_ == 0)
+        return nullptr;
+    const MutexLock lock(mutex_);
+    if (requeued_.empty() || stopping_)
+        return nullptr;
+    ListenerTask* task = requeued_.front();
+    requeued_.pop_front();
+    --requeuedCount_;
+    return task;
+}
+
+bool ListenerPool::parkWhileEnoughRun(Worker& worker) {
+    const MutexLock lock(mutex_);
+    unsigned active = active_;
+    do {
+        if (active <= running_ || stopping_)
+            return true;
+    } while (!active_.compare_exchange_weak(active, active - 1));
+    ++parked_;
+    const Clock::time_point end = Clock::now() + threadIdle_;
+    while (called_ == 0 && !stopping_) {
+        const auto left = end - Clock::now();
+        if (left > Clock::duration::zero()) {
+            parkedWake_.waitFor(mutex_, left);
+            continue;
+        }
+        --parked_;
+        messagesOfEnded_ += worker.scratch.messages.load(std::memory_order_relaxed);
+        const auto self =
+            std::find_if(workers_.begin(), workers_.end(), [&](const auto& other) { return other.get() == &worker; });
+        ended_.push_back(std::move(*self));
+        workers_.erase(self);
+        return false;
+    }
+    --parked_;
+    if (called_ > 0)
+        --called_;
+    else
+        ++active_;
+    return true;
+}
+
+void ListenerPool::Worker::willBlock() {
+    if (blockingDepth++ > 0)
+        return;
+    std::uint64_t seen = state;
+    // The watcher may have counted this worker as blocked already.
+    if ((seen & phaseMask) == static_cast<std::uint64_t>(Phase::working) &&
+        state.compare_exchange_strong(seen, (seen & ~phaseMask) | static_cast<std::uint64_t>(Phase::blocked)))
+        --pool.active_;
+    if (pool.waiting_ == 0)
+        pool.addWorker();
+}
+
+void ListenerPool::Worker::didBlock() {
+    if (--blockingDepth > 0)
+        return;
+    // In this phase nobody else changes the state.
+    const std::uint64_t seen = state;
+    if ((seen & phaseMask) != static_cast<std::uint64_t>(Phase::blocked))
+        return;
+    state = (seen & ~phaseMask) | static_cast<std::uint64_t>(Phase::working);
+    ++pool.active_;
+}
+
+// Growth.
+
+bool ListenerPool::canGrow() const {
+    return parked_ > called_ || workers_.size() < threadsMax_;
+}
+
+void ListenerPool::addWorker() {
+    const MutexLock lock(mutex_);
+    addWorkerLocked();
+}
+
+bool ListenerPool::addWorkerLocked() {
+    if (stopping_ || active_ >= running_)
+        return false;
+    joinEnded();
+    if (parked_ > called_) {
+        ++called_;
+        ++active_;
+        parkedWake_.signal();
+        return true;
+    }
+    return workers_.size() < threadsMax_ && startThread();
+}
+
+bool ListenerPool::startThread() {
+    auto worker = std::make_unique<Worker>(*this);
+    ++active_;
+    Worker* raw = worker.get();
+    if (!startThreadWithoutSignals(worker->thread, "listener", [this, raw] { work(*raw); })) {
+        --active_;
+        return false;
+    }
+    workers_.push_back(std::move(worker));
+    threadsMost_ = std::max(threadsMost_, static_cast<unsigned>(workers_.size()));
+    return true;
+}
+
+void ListenerPool::joinEnded() {
+    // They gave up the mutex with their last step, so this waits for no more than their way out.
+    for (const auto& worker : ended_)
+        worker->thread.join();
+    ended_.clear();
+}
+
+void ListenerPool::wakeWaiting() {
+    const std::uint64_t one = 1;
+    // It fails only when the counter is full, and then there is an event already.
+    [[maybe_unused]] const ssize_t written = ::write(wake_.get(), &one, sizeof one);
+}
+
+void ListenerPool::nobodyWaits() {
+    if (active_ < running_)
+        addWorker();
+    if (!watching_ && !watching_.exchange(true)) {
+        // The watcher looks at the flag under the mutex: it is before that look, or in its wait.
+        mutex_.lock();
+        mutex_.unlock();
+        watcherWake_.signal();
+    }
+}
+
+// The watcher: finds handlers that wait without having said so, and makes up for threads that could not be started.
+
+void ListenerPool::watch() {
+    const MutexLock lock(mutex_);
+    Clock::time_point nextTick = Clock::now();
+    bool wasWatching = false;
+    while (!stopping_) {
+        const bool watching = watching_;
+        if (watching && !wasWatching)
+            nextTick = Clock::now() + tick_;
+        wasWatching = watching;
+        if (!watching && !laterJob_) {
+            watcherWake_.wait(mutex_);
+            continue;
+        }
+        const Clock::time_point next = !laterJob_ ? nextTick : !watching ? laterAt_ : std::min(nextTick, laterAt_);
+        const Clock::time_point now = Clock::now();
+        if (next > now) {
+            watcherWake_.waitFor(mutex_, next - now);
+            continue;
+        }
+        if (laterJob_ && laterAt_ <= now) {
+            const std::function<void()> job = std::exchange(laterJob_, nullptr);
+            mutex_.unlock();
+            job();
+            mutex_.lock();
+            continue;
+        }
+        nextTick = now + tick_;
+        tick();
+    }
+}
+
+void ListenerPool::tick() {
+    if (waiting_ > 0 || !canGrow()) {
+        watching_ = false;
+        // Between the look and the flag the last one may have stopped waiting, and left the flag to this thread.
+        if (waiting_ > 0 || !canGrow() || watching_.exchange(true))
+            return;
+    }
+    for (const auto& worker : workers_) {
+        std::uint64_t state = worker->state;
+        const bool sameTask = state == worker->stateSeen;
+        worker->stateSeen = state;
+        if ((state & phaseMask) != static_cast<std::uint64_t>(Phase::working) || !sameTask ||
+            isRunning(worker->threadId) || !workIsReady())
+            continue;
+        if (worker->state.compare_exchange_strong(state,
+                                                  (state & ~phaseMask) | static_cast<std::uint64_t>(Phase::blocked)))
+            --active_;
+    }
+    while (addWorkerLocked()) {
+    }
+}
+
+bool ListenerPool::workIsReady() const {
+    pollfd epoll = {.fd = epoll_.get(), .events = POLLIN, .revents = 0};
+    return requeuedCount_ > 0 || ::poll(&epoll, 1, 0) > 0;
+}
+
+bool ListenerPool::isRunning(pid_t threadId) {
+    char path[64];
+    std::snprintf(path, sizeof path, "/proc/self/task/%d/stat", static_cast<int>(threadId));
+    const FileDescriptor file(::openat(AT_FDCWD, path, O_RDONLY | O_CLOEXEC));
+    char text[128];
+    const ssize_t size = file.valid() ? ::read(file.get(), text, sizeof text) : -1;
+    if (size <= 0)
+        return false;
+    // "TID (NAME) STATE ...": the name may hold anything, so its end is the last parenthesis.
+    const std::string_view line(text, static_cast<std::size_t>(size));
+    const std::size_t nameEnd = line.rfind(')');
+    return nameEnd != std::string_view::npos && nameEnd + 2 < line.size() && line[nameEnd + 2] == 'R';
+}
+
+} // namespace zor::platform
