@@ -20,10 +20,9 @@ constexpr std::string_view identifierKey = "ZORMetadataIdentifier";     // strin
 constexpr std::string_view uuidKey = "ZORMetadataUUID";                 // string
 constexpr std::string_view infoKey = "ZORMetadataInfo";                 // dictionary; may be missing
 
-template <typename... Arguments>
-ZORError refusal(ErrorCode code, int line, const char* format, Arguments... arguments) {
+ZORError refusal(ErrorCode code, int line, std::string description) {
     return {Here{"readAndValidateMetadataAtUrl", line}, ErrorDomain::zor, static_cast<int>(code),
-            formatted(format, arguments...)};
+            std::move(description)};
 }
 
 /// The 64 bits of an integer of either sign, as the file's readers take it.
@@ -39,7 +38,7 @@ std::string_view withoutLastComponent(std::string_view path) { return path.subst
 
 } // namespace
 
-#define ZOR_REFUSE(...) return refusal(ErrorCode::metadataInvalid, __LINE__, __VA_ARGS__)
+#define ZOR_REFUSE(...) return refusal(ErrorCode::metadataInvalid, __LINE__, formatted(__VA_ARGS__))
 
 ContainerPlace::ContainerPlace(std::shared_ptr<const std::string> parentPath, std::string_view name)
     : parentPath_(std::move(parentPath)) {
@@ -92,8 +91,8 @@ Result<std::shared_ptr<ZORMetadata>> parseMetadata(std::span<const std::uint8_t>
     const auto value = plist::readPropertyList(bytes);
     const plist::Dictionary* content = value ? value->asDictionary() : nullptr;
     if (!content)
-        return refusal(ErrorCode::metadataUnreadable, __LINE__, "Failed to read metadata at URL %s",
-                       place.url().c_str());
+        return refusal(ErrorCode::metadataUnreadable, __LINE__,
+                       formatted("Failed to read metadata at URL %s", place.url().c_str()));
     const plist::Value* persona = content->find(personaKey);
     if (persona) {
         const auto stored = integerBits(*persona);
