@@ -2,8 +2,8 @@
 // Property-list values: what messages, metadata files, the registry and the entitlement file are made of.
 //
 // A value owns everything below it; copying copies the tree. A dictionary keeps its entries sorted by key in one flat
-// array: small (most have under ten entries), compact, compared and searched without hashing. Nothing here locks: a value
-// belongs to one thread, or is const. Depth is bounded by the readers (Limits.h), so destruction may recurse.
+// array: small (most have under ten entries), compact, compared and searched without hashing. Nothing here locks: a
+// value belongs to one thread, or is const. Depth is bounded by the readers (Limits.h), so destruction may recurse.
 #pragma once
 
 #include <cstddef>
@@ -88,7 +88,8 @@ public:
     Value(Array value) : storage_(std::move(value)) {}
     Value(Dictionary value) : storage_(std::move(value)) {}
     /// Nothing else turns into a boolean by accident.
-    template <typename T> Value(T*) = delete;
+    template <typename T>
+    Value(T*) = delete;
 
     [[nodiscard]] Type type() const { return static_cast<Type>(storage_.index()); }
 

@@ -3,7 +3,7 @@
 
 #include <charconv>
 #include <chrono>
-#include <limits>
+#include <memory>
 
 namespace zor::plist::xml {
 
@@ -59,8 +59,8 @@ std::optional<Value> parseInteger(std::string_view text) {
         text.remove_prefix(2);
     }
     std::uint64_t magnitude = 0;
-    const char* end = text.data() + text.size();
-    const auto [stop, error] = std::from_chars(text.data(), end, magnitude, base);
+    const char* end = std::to_address(text.end());
+    const auto [stop, error] = std::from_chars(std::to_address(text.begin()), end, magnitude, base);
     if (error != std::errc() || stop != end)
         return std::nullopt;
     if (!minus)
@@ -78,8 +78,8 @@ std::optional<Value> parseReal(std::string_view text) {
     if (text.empty() || text.front() == '-')
         return std::nullopt;
     double number = 0;
-    const char* end = text.data() + text.size();
-    const auto [stop, error] = std::from_chars(text.data(), end, number);
+    const char* end = std::to_address(text.end());
+    const auto [stop, error] = std::from_chars(std::to_address(text.begin()), end, number);
     if (error != std::errc() || stop != end)
         return std::nullopt;
     return Value(minus ? -number : number);
