@@ -1,0 +1,25 @@
+// SPDX-License-Identifier: Apache-2.0
+// What the daemon is told on its command line.
+#pragma once
+
+#include <expected>
+#include <string>
+
+namespace zor {
+
+struct DaemonOptions {
+    std::string rootDirectory = "/";
+    bool foreground = false;
+    int logLevel = 5;
+    bool forgetBoot = false;
+};
+
+/// Why the daemon does not start from this command line: a text to show and the exit status (0 for --help and --version).
+struct OptionsEnd {
+    std::string text;
+    int exitStatus = 0;
+};
+
+[[nodiscard]] std::expected<DaemonOptions, OptionsEnd> parseDaemonOptions(int argumentCount, char** arguments);
+
+} // namespace zor

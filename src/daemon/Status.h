@@ -1,0 +1,30 @@
+// SPDX-License-Identifier: Apache-2.0
+// What the status socket tells: to every peer, whom the daemon takes it for and why; to the owners of the root, also how the
+// daemon is doing.
+#pragma once
+
+#include "daemon/Composition.h"
+#include "platform/PeerIdentity.h"
+#include "plist/Value.h"
+
+#include <functional>
+
+namespace zor {
+
+class Status {
+public:
+    /// `platformCounters` adds what only the platform's own objects count.
+    Status(Composition& composition, std::function<void(plist::Dictionary&)> platformCounters)
+        : composition_(composition), platformCounters_(std::move(platformCounters)) {}
+
+    /// The dictionary for one peer: "Peer", and "Counters" where the peer may know them.
+    [[nodiscard]] plist::Dictionary forPeer(platform::Peer& peer);
+
+private:
+    [[nodiscard]] plist::Dictionary counters();
+
+    Composition& composition_;
+    const std::function<void(plist::Dictionary&)> platformCounters_;
+};
+
+} // namespace zor
