@@ -24,11 +24,9 @@ std::int64_t coarseMilliseconds() {
     return std::int64_t{now.tv_sec} * 1000 + now.tv_nsec / 1'000'000;
 }
 
-std::shared_ptr<const RegistryEntry> entryNamed(const IdentityRegistry::Snapshot* snapshot, const std::string& name) {
-    if (!snapshot)
-        return nullptr;
-    const auto found = std::ranges::find(snapshot->entries, name, &IdentityRegistry::Registered::fileName);
-    return found == snapshot->entries.end() ? nullptr : found->entry;
+std::shared_ptr<const RegistryEntry> entryNamed(const IdentityRegistry::Snapshot& snapshot, const std::string& name) {
+    const auto found = std::ranges::find(snapshot.entries, name, &IdentityRegistry::Registered::fileName);
+    return found == snapshot.entries.end() ? nullptr : found->entry;
 }
 
 } // namespace
@@ -36,7 +34,7 @@ std::shared_ptr<const RegistryEntry> entryNamed(const IdentityRegistry::Snapshot
 IdentityRegistry::IdentityRegistry(const SystemRoot& root, PlatformLog& log, uid_t daemonUserId)
     : log_(log), directory_(root, daemonUserId), watches_(root), noticeDescriptor_(watches_.descriptor()) {
     const MutexLock lock(reading_);
-    look(Read::all);
+    publish({});
 }
 
 bool IdentityRegistry::follow(RunLoop& loop) {
@@ -85,6 +83,8 @@ bool IdentityRegistry::lookAgain() {
 }
 
 void IdentityRegistry::lookAtNotices() {
+    if (!hasLooked_)
+        return look(Read::all);
     const RegistryWatches::Noticed noticed = watches_.take();
     if (noticed != RegistryWatches::Noticed::nothing)
         look(noticed == RegistryWatches::Noticed::registry ? Read::all : Read::changed);
@@ -95,9 +95,9 @@ void IdentityRegistry::lookAtNotices() {
 void IdentityRegistry::look(Read read) {
     lookedMilliseconds_ = coarseMilliseconds();
     dueMilliseconds_.store(lookedMilliseconds_ + lookEveryMilliseconds, std::memory_order_relaxed);
-    const auto old = snapshot();
-    if (read == Read::changed && old && looksUnchanged(*old))
+    if (read == Read::changed && hasLooked_ && looksUnchanged(*snapshot()))
         return;
+    hasLooked_ = true;
     // A watch comes before the look at what it watches: what changes in between is then told, and read once more.
     watches_.begin();
     watches_.watchRegistry();
@@ -129,7 +129,7 @@ std::vector<IdentityRegistry::Registered> IdentityRegistry::readEntries(const Re
     std::size_t bytesLeft = allBytesMax;
     for (const auto& [name, stamp] : listing.files) {
         const auto before = listing_.files.find(name);
-        auto entry = entryNamed(old.get(), name);
+        auto entry = entryNamed(*old, name);
         const bool isAsBefore = entry && before != listing_.files.end() && before->second == stamp;
         const auto bytes = static_cast<std::size_t>(stamp.bytes);
         if (bytes > bytesLeft) {

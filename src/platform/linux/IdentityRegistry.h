@@ -43,7 +43,8 @@ public:
         std::vector<Registered> entries;
     };
 
-    /// Reads the registry. Files may belong to root and to `daemonUserId`.
+    /// Files may belong to root and to `daemonUserId`. Nothing is read until somebody asks, so that what is wrong with
+    /// a file is said when the log is open.
     IdentityRegistry(const SystemRoot& root, PlatformLog& log, uid_t daemonUserId);
     IdentityRegistry(const IdentityRegistry&) = delete;
     IdentityRegistry& operator=(const IdentityRegistry&) = delete;
@@ -90,6 +91,7 @@ private:
     RegistryListing listing_ ZOR_GUARDED_BY(reading_);
     std::vector<std::string> problemsSaid_ ZOR_GUARDED_BY(reading_);
     std::int64_t lookedMilliseconds_ ZOR_GUARDED_BY(reading_) = 0;
+    bool hasLooked_ ZOR_GUARDED_BY(reading_) = false;
     const int noticeDescriptor_;
 
     mutable Mutex publishing_;

@@ -35,6 +35,10 @@ SerialWorkQueue::SerialWorkQueue(std::string label, Priority priority)
     : label_(std::move(label)), priority_(priority) {}
 
 SerialWorkQueue::~SerialWorkQueue() {
+    finish();
+}
+
+void SerialWorkQueue::finish() {
     std::deque<std::function<void()>> dropped;
     std::thread thread;
     {
@@ -49,11 +53,15 @@ SerialWorkQueue::~SerialWorkQueue() {
     dropped.clear();
     if (thread.joinable())
         thread.join();
+    const MutexLock lock(mutex_);
+    finished_ = true;
 }
 
 void SerialWorkQueue::async(std::function<void()> job) {
     {
         const MutexLock lock(mutex_);
+        if (finished_)
+            return;
         jobs_.push_back(std::move(job));
         if (!thread_.joinable() && !ending_) {
             try {
@@ -69,7 +77,7 @@ void SerialWorkQueue::async(std::function<void()> job) {
 
 void SerialWorkQueue::suspend() {
     const MutexLock lock(mutex_);
-    suspended_ = true;
+    suspended_ = !ending_;
 }
 
 void SerialWorkQueue::resume() {

@@ -24,8 +24,11 @@ public:
 
     /// Throws std::system_error, and queues nothing, when the system gives no thread for the first job.
     void async(std::function<void()> job) override;
+    // After a finish has begun neither has any effect.
     void suspend() override;
     void resume() override;
+    /// For whoever goes before the queue does, and is what the jobs act on. Not from a job.
+    void finish();
 
 private:
     void work();
@@ -39,6 +42,7 @@ private:
     std::deque<std::function<void()>> jobs_ ZOR_GUARDED_BY(mutex_);
     bool suspended_ ZOR_GUARDED_BY(mutex_) = false;
     bool ending_ ZOR_GUARDED_BY(mutex_) = false;
+    bool finished_ ZOR_GUARDED_BY(mutex_) = false;
     std::thread thread_ ZOR_GUARDED_BY(mutex_);
 };
 

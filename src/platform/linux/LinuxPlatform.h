@@ -1,0 +1,93 @@
+// SPDX-License-Identifier: Apache-2.0
+// One of each role of the platform, on Linux: what a daemon runs on. Made by main, or by a test over a root of its own;
+// several can live in one process, over different roots.
+//
+// The order of the members is the order in which they come into being; they go the other way round.
+#pragma once
+
+#include "platform/Platform.h"
+#include "platform/linux/DaemonLock.h"
+#include "platform/linux/DeviceQueries.h"
+#include "platform/linux/EpollRunLoop.h"
+#include "platform/linux/FileCrashAnnotation.h"
+#include "platform/linux/FileDeviceLockState.h"
+#include "platform/linux/IdentityRegistry.h"
+#include "platform/linux/LinkSandboxUserState.h"
+#include "platform/linux/LinuxDisk.h"
+#include "platform/linux/LinuxPasswordDatabase.h"
+#include "platform/linux/LinuxPeerIdentity.h"
+#include "platform/linux/LinuxServiceListener.h"
+#include "platform/linux/PassedSockets.h"
+#include "platform/linux/RotatingLog.h"
+#include "platform/linux/SemaphoreBootMarker.h"
+#include "platform/linux/SeqpacketUpcallPort.h"
+#include "platform/linux/SerialWorkQueue.h"
+#include "platform/linux/SystemRoot.h"
+#include "platform/linux/XattrProtectionClass.h"
+
+#include <expected>
+#include <memory>
+#include <string>
+
+namespace zor::platform {
+
+class LinuxPlatform {
+public:
+    struct Options {
+        std::string rootDirectory = "/";
+        RotatingLog::Foreground foreground = RotatingLog::Foreground::no;
+        /// On "/" they are on, whatever is asked for.
+        Syncs syncs = Syncs::on;
+        PassedSockets passed;
+        ListenerLimits listenerLimits;
+    };
+
+    /// Opens the root, makes the runtime directory and takes the daemon's lock; nothing is served yet. Else one line
+    /// that says what stood in the way.
+    [[nodiscard]] static std::expected<std::unique_ptr<LinuxPlatform>, std::string> open(Options options);
+    ~LinuxPlatform();
+    LinuxPlatform(const LinuxPlatform&) = delete;
+    LinuxPlatform& operator=(const LinuxPlatform&) = delete;
+
+    [[nodiscard]] Platform roles();
+
+    [[nodiscard]] const SystemRoot& root() const { return root_; }
+    [[nodiscard]] EpollRunLoop& runLoop() { return runLoop_; }
+    [[nodiscard]] LinuxServiceListener& listener() { return listener_; }
+    [[nodiscard]] LinuxPeerIdentity& peers() { return peers_; }
+    [[nodiscard]] SemaphoreBootMarker& bootMarker() { return bootMarker_; }
+    [[nodiscard]] RotatingLog& log() { return log_; }
+    [[nodiscard]] PassedSockets& passedSockets() { return passed_; }
+
+    /// Stops the listener and finishes the queues: from then on nothing calls into what was built on the roles. To be
+    /// called before that goes.
+    void finish();
+
+private:
+    LinuxPlatform(SystemRoot root, DaemonLock lock, Options options);
+    [[nodiscard]] ListenerOptions listenerOptions(const ListenerLimits& limits);
+
+    SystemRoot root_;
+    DaemonLock lock_;
+    PassedSockets passed_;
+    LinuxDisk disk_;
+    RotatingLog log_;
+    LinuxInternalBuildQuery internalBuild_{root_};
+    LinuxSystemVersionQuery systemVersion_{root_};
+    LinuxPasswordDatabase passwords_{root_};
+    FileDeviceLockState lockState_{root_};
+    XattrProtectionClass protection_{root_, disk_, lockState_};
+    LinkSandboxUserState sandbox_{root_, disk_};
+    FileCrashAnnotation crash_{root_, disk_};
+    SemaphoreBootMarker bootMarker_{root_};
+    ServiceTransactions transactions_;
+    EpollRunLoop runLoop_;
+    IdentityRegistry registry_;
+    LinuxPeerIdentity peers_;
+    SeqpacketUpcallPort upcallPort_;
+    LinuxServiceListener listener_;
+    SerialWorkQueue deathRowQueue_;
+    SerialWorkQueue lockStateQueue_;
+};
+
+} // namespace zor::platform
