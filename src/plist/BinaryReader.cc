@@ -1,8 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Reads the binary form. Every place and count is compared with what the input still holds before it is used, and every
-// piece of memory is charged before it is taken: the sum of charges stays below memoryBytesPerInputByte for each input
-// byte, however often objects are shared. Containers being read are on a stack of at most nestingMax: meeting one again
-// is a cycle.
+// piece of memory is charged before it is taken: the sum of charges stays within memoryBytesMax of the input, however
+// often objects are shared. Containers being read are on a stack of at most nestingMax: meeting one again is a cycle.
 #include "plist/Binary.h"
 #include "plist/BinaryFormat.h"
 #include "plist/Limits.h"
@@ -33,7 +32,7 @@ std::uint64_t bigEndian(const std::uint8_t* at, std::size_t width) {
 
 class Reader {
 public:
-    explicit Reader(Bytes bytes) : bytes_(bytes), memoryLeft_(bytes.size() * memoryBytesPerInputByte) {}
+    explicit Reader(Bytes bytes) : bytes_(bytes), memoryLeft_(memoryBytesMax(bytes.size())) {}
 
     std::expected<Value, ReadError> read();
 
@@ -370,9 +369,13 @@ bool Reader::readDictionary(const Header& header, Value& out) {
     return true;
 }
 
-// A container that shares nothing has to fit its own charge, with the payload of each member to spare.
-static_assert(sizeof(Value) < memoryBytesPerInputByte);
-static_assert(sizeof(Dictionary::Entry) < 2 * memoryBytesPerInputByte);
+// A container that shares nothing has to fit its own charge, with the payload of each member to spare. The members of a
+// long list, of at least 256 objects, take two bytes of reference, one of marker and two of offset each.
+constexpr std::size_t longInputBytes = std::size_t{1} << 30;
+static_assert(sizeof(Value) < memoryBytesMax(1));
+static_assert(sizeof(Dictionary::Entry) < memoryBytesMax(2));
+static_assert(sizeof(Value) < memoryBytesMax(longInputBytes + 5) - memoryBytesMax(longInputBytes));
+static_assert(sizeof(Dictionary::Entry) < memoryBytesMax(longInputBytes + 10) - memoryBytesMax(longInputBytes));
 
 } // namespace
 
