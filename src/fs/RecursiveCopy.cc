@@ -19,6 +19,7 @@
 #include <sys/random.h>
 #include <sys/stat.h>
 #include <unistd.h>
+#include <vector>
 
 namespace zor::fs {
 
@@ -85,6 +86,8 @@ private:
     const int toDirectory_;
     const char* const to_;
     DirectoryStack destination_;
+    /// Of the source's directory of each level, from before it was read.
+    std::vector<timespec> accessTimes_;
     FileDescriptor links_;
     std::string linksName_;
 };
@@ -145,6 +148,7 @@ int Copier::beginDirectory(const WalkEntry& entry) {
     if (::fstat(directory->get(), &status) != 0)
         return -errno;
     destination_.push(std::move(*directory), status.st_dev, status.st_ino, name);
+    accessTimes_.push_back(entry.status.st_atim);
     return 0;
 }
 
@@ -158,10 +162,13 @@ int Copier::endDirectory(const WalkEntry& entry) {
     std::size_t levelsLost = 0;
     if (!destination_.ensureParent(levelsLost))
         return -ESTALE;
-    const int result =
-        attributes_.copy(entry.directory, destination_.top(), entry.status, entry.status.st_mode & permissionBits);
-    if (result == 0)
+    struct stat status = entry.status;
+    status.st_atim = accessTimes_.back();
+    const int result = attributes_.copy(entry.directory, destination_.top(), status, status.st_mode & permissionBits);
+    if (result == 0) {
         destination_.pop();
+        accessTimes_.pop_back();
+    }
     return result;
 }
 

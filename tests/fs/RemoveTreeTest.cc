@@ -1,0 +1,269 @@
+// SPDX-License-Identifier: Apache-2.0
+// Goal: a removal takes the whole tree and nothing else, says what it could not take, and never calls a failure a
+// success. Method: real trees with immutable items, mounts of failures by a failing disk, and an owner who moves things
+// about.
+#include "fs/RecursiveRemove.h"
+
+#include "fs/TreeWorld.h"
+#include "support/FaultLoop.h"
+#include "support/ProcessResources.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <linux/fs.h>
+#include <memory>
+#include <sys/ioctl.h>
+#include <unistd.h>
+
+namespace zor::fs::test {
+namespace {
+
+using platform::FileDescriptor;
+using support::TemporaryDirectory;
+
+bool setFlags(int parent, const std::string& path, int flags) {
+    const FileDescriptor fd(::openat(parent, path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+    return ::ioctl(fd.get(), FS_IOC_SETFLAGS, &flags) == 0;
+}
+
+int flagsOf(int parent, const std::string& path) {
+    const FileDescriptor fd(::openat(parent, path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+    int flags = 0;
+    return ::ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) == 0 ? flags & (FS_IMMUTABLE_FL | FS_APPEND_FL) : -1;
+}
+
+/// The paths of failed items, and of directories made mutable with a "+".
+struct Said {
+    std::string text;
+    RemoveCallbacks callbacks(RemoveAnswer answer = RemoveAnswer::proceed) {
+        return {.failed =
+                    [this, answer](const RemoveFailure& failure) {
+                        text += failure.path + ":" + std::to_string(failure.error) + " ";
+                        return answer;
+                    },
+                .directoryMadeMutable = [this](const std::string& path) { text += "+" + path + " "; }};
+    }
+};
+
+// Links, FIFOs and files as well as trees; links to the outside go, what they point to stays.
+TEST(RemoveTree, RemovesWhateverItIsGiven) {
+    World world;
+    world.makeTree();
+    const support::ProcessResources before;
+    makeFile(world.fd(), "file");
+    makeLink(world.fd(), "link", world.path() + "/outside");
+    makeFifo(world.fd(), "fifo");
+    makeDirectory(world.fd(), "empty");
+    for (const char* name : {"tree", "file", "link", "fifo", "empty"}) {
+        EXPECT_EQ(removeTree(world.disk, world.fd(), name), 0) << name;
+        EXPECT_FALSE(exists(world.fd(), name)) << name;
+        Said said;
+        EXPECT_EQ(removeTree(world.disk, world.fd(), name, said.callbacks()), -ENOENT) << name;
+        EXPECT_EQ(said.text, "") << name;
+    }
+    EXPECT_EQ(world.damage(), "");
+    EXPECT_EQ(before.leakedSince(), "");
+}
+
+struct FlagCase {
+    const char* path;
+    int flags;
+    /// What the callbacks hear, and what the form without them returns.
+    const char* said;
+    int result;
+};
+
+// Directories that may not change are made mutable; an immutable file is the callback's to repair; the directory that
+// holds the root is never touched.
+TEST(RemoveTree, ClearsFlagsOfDirectoriesInsideTheTree) {
+    const FlagCase cases[] = {
+        {"top/tree/a/b/file", FS_IMMUTABLE_FL, "a/b/file:1 a/b:39 a:39 :39 ", -EPERM},
+        {"top/tree/a/b/file", FS_APPEND_FL, "a/b/file:1 a/b:39 a:39 :39 ", -EPERM},
+        {"top/tree/a/b", FS_IMMUTABLE_FL, "+a/b ", 0},
+        {"top/tree/a/b", FS_APPEND_FL, "+a/b ", 0},
+        {"top/tree/a/empty", FS_IMMUTABLE_FL, "+a/empty ", 0},
+        {"top/tree", FS_IMMUTABLE_FL, "+ ", 0},
+        {"top", FS_IMMUTABLE_FL, ":1 ", -EPERM},
+        {"top", FS_APPEND_FL, ":1 ", -EPERM},
+    };
+    if (::geteuid() != 0)
+        GTEST_SKIP() << "only root may set inode flags";
+    platform::LinuxDisk disk;
+    for (const FlagCase& row : cases) {
+        for (const bool withCallbacks : {false, true}) {
+            const TemporaryDirectory directory("/tmp");
+            const FileDescriptor root = openDirectory(AT_FDCWD, directory.path());
+            for (const char* path : {"top", "top/tree", "top/tree/a", "top/tree/a/b", "top/tree/a/empty"})
+                makeDirectory(root.get(), path);
+            makeFile(root.get(), "top/tree/a/b/file");
+            if (!setFlags(root.get(), row.path, row.flags))
+                GTEST_SKIP() << "no inode flags in /tmp";
+            const FileDescriptor top = openDirectory(root.get(), "top");
+            Said said;
+            const int result = withCallbacks ? removeTree(disk, top.get(), "tree", said.callbacks())
+                                             : removeTree(disk, top.get(), "tree");
+            EXPECT_EQ(result, withCallbacks ? 0 : row.result) << row.path;
+            EXPECT_EQ(said.text, withCallbacks ? row.said : "") << row.path;
+            EXPECT_EQ(exists(top.get(), "tree"), row.result != 0) << row.path;
+            EXPECT_FALSE(exists(top.get(), "tree/a/empty")) << row.path;
+            // What was not to be touched still has its flag; then the test may clean up.
+            if (row.result != 0) {
+                EXPECT_EQ(flagsOf(root.get(), row.path), row.flags) << row.path;
+                setFlags(root.get(), row.path, 0);
+            }
+        }
+    }
+}
+
+// The repair that a callback makes: the flag alone is cleared, links and FIFOs are left alone, and the removal then
+// succeeds.
+TEST(RemoveTree, LetsACallbackRepairImmutableFiles) {
+    if (::geteuid() != 0)
+        GTEST_SKIP() << "only root may set inode flags";
+    const TemporaryDirectory directory("/tmp");
+    const FileDescriptor root = openDirectory(AT_FDCWD, directory.path());
+    makeDirectory(root.get(), "tree");
+    makeFile(root.get(), "tree/file");
+    makeFile(root.get(), "outside");
+    if (!setFlags(root.get(), "tree/file", FS_IMMUTABLE_FL | FS_APPEND_FL) ||
+        !setFlags(root.get(), "outside", FS_IMMUTABLE_FL))
+        GTEST_SKIP() << "no inode flags in /tmp";
+    makeLink(root.get(), "link", "outside");
+    makeFifo(root.get(), "fifo");
+    platform::LinuxDisk disk;
+    EXPECT_EQ(clearImmutable(disk, root.get(), "link"), 0);
+    EXPECT_EQ(clearImmutable(disk, root.get(), "fifo"), 0);
+    EXPECT_EQ(clearImmutable(disk, root.get(), "missing"), -ENOENT);
+    EXPECT_EQ(clearImmutable(disk, root.get(), "tree"), 0);
+    EXPECT_EQ(clearImmutable(disk, root.get(), "tree/file"), 1);
+    EXPECT_EQ(flagsOf(root.get(), "tree/file"), FS_APPEND_FL);
+    EXPECT_EQ(flagsOf(root.get(), "outside"), FS_IMMUTABLE_FL);
+    setFlags(root.get(), "outside", 0);
+    setFlags(root.get(), "tree/file", FS_IMMUTABLE_FL);
+    int repaired = 0;
+    const RemoveCallbacks callbacks = {.failed = [&](const RemoveFailure& failure) {
+        EXPECT_EQ(failure.path, "file");
+        EXPECT_EQ(failure.error, EPERM);
+        repaired += clearImmutable(disk, failure.parent, failure.name);
+        EXPECT_EQ(disk.unlinkFile(failure.parent, failure.name), 0);
+        return RemoveAnswer::proceed;
+    }};
+    EXPECT_EQ(removeTree(disk, root.get(), "tree", callbacks), 0);
+    EXPECT_EQ(repaired, 1);
+    EXPECT_FALSE(exists(root.get(), "tree"));
+}
+
+// Names that come into a directory while it is removed are removed as well; a root that turns into something else, too.
+TEST(RemoveTree, RemovesWhatIsAddedMeanwhile) {
+    World world;
+    makeDirectory(world.fd(), "tree");
+    makeFile(world.fd(), "tree/file");
+    int additions = 0;
+    support::FaultDisk disk(world.disk);
+    // The filter sees each call before it is made.
+    disk.arm({.point = 1000, .filter = [&](const support::DiskCallInfo& info) {
+                  if (info.call == support::DiskCall::removeDirectory && info.subject == "tree" && additions < 10) {
+                      makeDirectory(world.fd(), "tree/new" + std::to_string(additions));
+                      makeFile(world.fd(), "tree/new" + std::to_string(additions) + "/f");
+                      ++additions;
+                  }
+                  return true;
+              }});
+    Said said;
+    EXPECT_EQ(removeTree(disk, world.fd(), "tree", said.callbacks()), 0);
+    EXPECT_EQ(said.text, "");
+    EXPECT_EQ(additions, 10);
+    EXPECT_FALSE(exists(world.fd(), "tree"));
+
+    makeDirectory(world.fd(), "tree");
+    bool swapped = false;
+    disk.arm({.point = 1000, .filter = [&](const support::DiskCallInfo&) {
+                  if (!std::exchange(swapped, true)) {
+                      ::unlinkat(world.fd(), "tree", AT_REMOVEDIR);
+                      makeLink(world.fd(), "tree", world.path() + "/outside");
+                  }
+                  return true;
+              }});
+    EXPECT_EQ(removeTree(disk, world.fd(), "tree"), 0);
+    EXPECT_FALSE(exists(world.fd(), "tree"));
+    EXPECT_EQ(world.damage(), "");
+}
+
+// Every call failing in turn: said and returned, the rest of the tree gone, no descriptor kept, and a second try
+// succeeds.
+TEST(RemoveTree, SaysEveryFailure) {
+    const support::ProcessResources before;
+    const auto report = support::forEachFaultPoint(
+        *std::make_unique<platform::LinuxDisk>(), {.error = EIO},
+        [](support::FaultDisk& disk) {
+            struct Prepared {
+                std::unique_ptr<World> world;
+                support::FaultDisk* disk;
+                int result = 0;
+            };
+            Prepared prepared{.world = std::make_unique<World>(), .disk = &disk};
+            for (const char* path : {"tree", "tree/a", "tree/a/b", "tree/c"})
+                makeDirectory(prepared.world->fd(), path);
+            for (const char* path : {"tree/f", "tree/a/f", "tree/a/b/f", "tree/a/b/g", "tree/c/f"})
+                makeFile(prepared.world->fd(), path);
+            return prepared;
+        },
+        [](auto& prepared) { prepared.result = removeTree(*prepared.disk, prepared.world->fd(), "tree"); },
+        [](auto& prepared, const support::FaultOutcome& outcome) -> std::string {
+            if (prepared.result != (outcome.met ? -EIO : 0))
+                return "returned " + std::to_string(prepared.result);
+            if (exists(prepared.world->fd(), "tree") != outcome.met)
+                return "the tree is " + std::string(outcome.met ? "gone" : "still there");
+            if (outcome.met && removeTree(prepared.world->disk, prepared.world->fd(), "tree") != 0)
+                return "a second try fails";
+            return prepared.world->damage();
+        });
+    EXPECT_EQ(report.complaint, "");
+    EXPECT_EQ(report.examined, 10U);
+    EXPECT_EQ(before.leakedSince(), "");
+}
+
+// An item that stays is told once, and so are the directories that stay because of it; stop ends the removal there.
+TEST(RemoveTree, TellsWhatStaysOnce) {
+    World world;
+    for (const RemoveAnswer answer : {RemoveAnswer::proceed, RemoveAnswer::stop}) {
+        for (const char* path : {"tree", "tree/a", "tree/a/b"})
+            makeDirectory(world.fd(), path);
+        makeFile(world.fd(), "tree/a/b/f");
+        support::FaultDisk disk(world.disk);
+        disk.arm(
+            {.error = EACCES, .span = support::FaultSpan::fromThenOn, .filter = [](const support::DiskCallInfo& info) {
+                 return info.call == support::DiskCall::unlinkFile;
+             }});
+        Said said;
+        const bool stops = answer == RemoveAnswer::stop;
+        EXPECT_EQ(removeTree(disk, world.fd(), "tree", said.callbacks(answer)), stops ? -EACCES : 0);
+        EXPECT_EQ(said.text, stops ? "a/b/f:13 " : "a/b/f:13 a/b:39 a:39 :39 ");
+        EXPECT_EQ(removeTree(world.disk, world.fd(), "tree"), 0);
+    }
+}
+
+// An owner who moves directories about all the time, and puts links in their place: nothing outside goes, and the tree
+// can be removed as soon as he is done.
+TEST(RemoveTree, StaysInATreeThatIsMovedAbout) {
+    World world;
+    const support::ProcessResources before;
+    std::size_t removals = 0;
+    for (const auto end = std::chrono::steady_clock::now() + raceTime(); std::chrono::steady_clock::now() < end;
+         ++removals) {
+        world.makeTree();
+        {
+            const Vandal vandal(world);
+            removeTree(world.disk, world.fd(), "tree");
+        }
+        removeTree(world.disk, world.fd(), "tree");
+        removeTree(world.disk, world.fd(), "outside/parking/moved");
+        ASSERT_FALSE(exists(world.fd(), "tree")) << removals;
+        ASSERT_EQ(world.damage(), "") << removals;
+    }
+    EXPECT_GT(removals, 3U);
+    EXPECT_EQ(before.leakedSince(), "");
+}
+
+} // namespace
+} // namespace zor::fs::test

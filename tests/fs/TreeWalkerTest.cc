@@ -1,0 +1,350 @@
+// SPDX-License-Identifier: Apache-2.0
+// Goal: a walk sees every item once and nothing that is not in the tree, whatever the tree's owner does meanwhile, at
+// any depth and width. Method: real trees, moved about between two visits (by the visitor itself) or by a thread.
+#include "fs/TreeWalker.h"
+
+#include "fs/RecursiveRemove.h"
+#include "fs/TreeWorld.h"
+#include "support/ProcessResources.h"
+
+#include <algorithm>
+#include <fcntl.h>
+#include <functional>
+#include <gtest/gtest.h>
+#include <map>
+#include <sched.h>
+#include <set>
+#include <sys/mount.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+namespace zor::fs::test {
+namespace {
+
+using platform::FileDescriptor;
+using support::TemporaryDirectory;
+
+const char* text(WalkEntryKind kind) {
+    switch (kind) {
+    case WalkEntryKind::directory:
+        return "directory";
+    case WalkEntryKind::directoryEnd:
+        return "end";
+    case WalkEntryKind::unreadableDirectory:
+        return "unreadable";
+    case WalkEntryKind::file:
+        return "file";
+    case WalkEntryKind::symbolicLink:
+        return "link";
+    case WalkEntryKind::other:
+        return "other";
+    case WalkEntryKind::noStatus:
+        return "no status";
+    }
+    return "";
+}
+
+/// "kind path" of every visit, sorted, since a directory has no order of its own.
+std::vector<std::string> visits(TreeWalker& walker, int parent, const char* name) {
+    std::vector<std::string> seen;
+    walker.walk(parent, name, [&](const WalkEntry& entry) {
+        seen.push_back(std::string(text(entry.kind)) + " " + entry.path() + (entry.onOtherFileSystem ? " (away)" : ""));
+        return WalkStep::proceed;
+    });
+    std::sort(seen.begin(), seen.end());
+    return seen;
+}
+
+/// Runs `body` with mounts of its own in a child. Empty, or its complaint; nothing when mounting is not permitted.
+std::optional<std::string> inMountNamespace(const std::function<std::string()>& body) {
+    int ends[2];
+    if (::pipe2(ends, O_CLOEXEC) != 0)
+        return "pipe";
+    FileDescriptor reading(ends[0]);
+    FileDescriptor writing(ends[1]);
+    const pid_t child = ::fork();
+    if (child == 0) {
+        if (::unshare(CLONE_NEWNS) != 0 || ::mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0)
+            ::_exit(2);
+        const std::string complaint = body();
+        [[maybe_unused]] const ssize_t written = ::write(writing.get(), complaint.data(), complaint.size());
+        ::_exit(0);
+    }
+    writing.reset();
+    std::string complaint;
+    char buffer[4096];
+    for (ssize_t count; (count = ::read(reading.get(), buffer, sizeof buffer)) > 0;)
+        complaint.append(buffer, static_cast<std::size_t>(count));
+    int status = 0;
+    ::waitpid(child, &status, 0);
+    if (WIFEXITED(status) && WEXITSTATUS(status) == 2)
+        return std::nullopt;
+    return WIFEXITED(status) && WEXITSTATUS(status) == 0 ? complaint : "the child died";
+}
+
+// Every kind of item, each directory before and after what it holds; links are not followed, dangling or not.
+TEST(TreeWalker, VisitsEveryItemOfATree) {
+    const TemporaryDirectory directory;
+    const FileDescriptor root = openDirectory(AT_FDCWD, directory.path());
+    makeDirectory(root.get(), "tree");
+    makeDirectory(root.get(), "tree/empty");
+    makeDirectory(root.get(), "tree/full");
+    makeFile(root.get(), "tree/full/.hidden");
+    makeLink(root.get(), "tree/full/dangling", "nowhere");
+    makeLink(root.get(), "tree/full/up", "..");
+    makeFifo(root.get(), "tree/fifo");
+    ASSERT_EQ(::mknodat(root.get(), "tree/socket", S_IFSOCK | 0600, 0), 0);
+    const std::vector<std::string> expected = {
+        "directory ",        "directory empty",    "directory full", "end ",       "end empty",   "end full",
+        "file full/.hidden", "link full/dangling", "link full/up",   "other fifo", "other socket"};
+    for (const WalkStatus status : {WalkStatus::full, WalkStatus::typeOnly}) {
+        TreeWalker walker(status);
+        auto sorted = expected;
+        std::sort(sorted.begin(), sorted.end());
+        EXPECT_EQ(visits(walker, root.get(), "tree"), sorted);
+        const FileDescriptor tree = openDirectory(root.get(), "tree");
+        EXPECT_EQ(visits(walker, tree.get(), "."), sorted);
+        EXPECT_EQ(visits(walker, root.get(), "tree/full/.hidden"), std::vector<std::string>{"file "});
+        EXPECT_EQ(visits(walker, root.get(), "tree/full/up"), std::vector<std::string>{"link "});
+    }
+    TreeWalker walker;
+    const auto proceed = [](const WalkEntry&) { return WalkStep::proceed; };
+    EXPECT_EQ(walker.walk(root.get(), "missing", proceed), -ENOENT);
+    EXPECT_EQ(walker.walk(root.get(), "tree",
+                          [](const WalkEntry& e) { return e.depth > 0 ? WalkStep::stop : WalkStep::proceed; }),
+              -ECANCELED);
+}
+
+// The descriptor, the name and the status of a visit belong to the same item; skip and again do what they say.
+TEST(TreeWalker, GivesWhatAVisitorNeeds) {
+    World world;
+    world.makeTree();
+    TreeWalker walker;
+    std::map<std::string, unsigned> ends;
+    walker.walk(world.fd(), "tree", [&](const WalkEntry& entry) {
+        struct stat status{};
+        EXPECT_EQ(::fstatat(entry.parent, entry.name, &status, AT_SYMLINK_NOFOLLOW), 0);
+        EXPECT_EQ(status.st_ino, entry.status.st_ino) << entry.path();
+        EXPECT_EQ(status.st_mode, entry.status.st_mode) << entry.path();
+        struct stat byPath{};
+        EXPECT_EQ(::fstatat(world.fd(), ("tree/" + entry.path()).c_str(), &byPath, AT_SYMLINK_NOFOLLOW), 0);
+        EXPECT_EQ(byPath.st_ino, entry.status.st_ino) << entry.path();
+        if (entry.directory >= 0) {
+            EXPECT_EQ(::fstat(entry.directory, &status), 0);
+            EXPECT_EQ(status.st_ino, entry.status.st_ino) << entry.path();
+        }
+        if (entry.kind == WalkEntryKind::directory && entry.path() == chainPath(2))
+            return WalkStep::skip;
+        if (entry.kind == WalkEntryKind::directoryEnd && ++ends[entry.path()] == 1 && entry.depth == 1)
+            return WalkStep::again;
+        return WalkStep::proceed;
+    });
+    EXPECT_EQ(ends.at(chainPath(2)), 2U);
+    EXPECT_EQ(ends.at(chainPath(1)), 2U);
+    EXPECT_FALSE(ends.contains(chainPath(3)));
+    EXPECT_EQ(ends.at(""), 1U);
+}
+
+struct Move {
+    const char* name;
+    /// Depths in the chain whose directories are moved out when the bottom is reached, in this order.
+    std::vector<std::size_t> depths;
+    /// Levels that cannot be returned to.
+    std::size_t lost;
+};
+
+// Directories moved away while the walk is below them, deeper than it keeps descriptors: it goes on where it may,
+// leaves what is lost, and never goes up into the place they were moved to.
+TEST(TreeWalker, GoesUpOnlyIntoDirectoriesItCameFrom) {
+    const Move moves[] = {
+        {.name = "none", .depths = {}, .lost = 0},
+        {.name = "its \"..\" leads out, its parent is where it was", .depths = {20}, .lost = 0},
+        // The first move makes ".." useless at depth 20, the second the names at depth 10: 10 to 20 are gone.
+        {.name = "parent away too", .depths = {20, 10}, .lost = 11},
+        {.name = "near the bottom, still open", .depths = {50}, .lost = 0},
+        {.name = "several", .depths = {30, 20, 10, 2}, .lost = 29},
+    };
+    for (const Move& move : moves) {
+        World world;
+        world.makeTree();
+        const std::string bottom = chainPath(World::chainDepth);
+        std::set<std::size_t> ended;
+        TreeWalker walker;
+        const int result = walker.walk(world.fd(), "tree", [&](const WalkEntry& entry) {
+            // Only the place to which directories are moved has this name in it.
+            EXPECT_FALSE(exists(entry.parent, "keep")) << move.name;
+            const bool isChain = entry.depth == 0 || entry.name[0] == 'a';
+            if (entry.kind != WalkEntryKind::directoryEnd || !isChain)
+                return WalkStep::proceed;
+            ended.insert(entry.depth);
+            for (const std::size_t depth : entry.path() == bottom ? move.depths : std::vector<std::size_t>{}) {
+                const std::string path = "tree/" + chainPath(depth);
+                const std::string to = "outside/parking/m" + std::to_string(depth);
+                EXPECT_EQ(::renameat(world.fd(), path.c_str(), world.fd(), to.c_str()), 0) << path;
+                makeLink(world.fd(), path, world.path() + "/" + to);
+            }
+            return WalkStep::proceed;
+        });
+        EXPECT_EQ(result, 0) << move.name;
+        EXPECT_EQ(walker.vanishedDirectories(), move.lost) << move.name;
+        EXPECT_EQ(ended.size(), World::chainDepth + 1 - move.lost) << move.name;
+        EXPECT_TRUE(ended.contains(0)) << move.name;
+    }
+}
+
+// A name that changes its kind between the reading of the directory and its turn is visited as what it is now.
+TEST(TreeWalker, VisitsWhatANameIsNow) {
+    World world;
+    makeDirectory(world.fd(), "tree");
+    constexpr int count = 9;
+    for (int i = 0; i < count; ++i)
+        makeDirectory(world.fd(), "tree/" + std::to_string(i));
+    std::map<std::string, std::string> kinds;
+    std::map<std::string, std::string> expected;
+    TreeWalker walker;
+    walker.walk(world.fd(), "tree", [&](const WalkEntry& entry) {
+        if (entry.depth == 0)
+            return WalkStep::proceed;
+        for (int i = 0; expected.empty() && i < count; ++i) {
+            const std::string name = std::to_string(i);
+            const std::string path = "tree/" + name;
+            if (name == entry.name)
+                continue;
+            EXPECT_EQ(::unlinkat(world.fd(), path.c_str(), AT_REMOVEDIR), 0);
+            if (i % 3 == 0)
+                makeLink(world.fd(), path, world.path() + "/outside");
+            if (i % 3 == 1)
+                makeFifo(world.fd(), path);
+        }
+        if (expected.empty()) {
+            expected = {{"0", "link"}, {"3", "link"}, {"6", "link"}, {"1", "other"}, {"4", "other"}, {"7", "other"}};
+            expected[entry.name] = "end";
+        }
+        kinds[entry.name] = text(entry.kind);
+        return WalkStep::proceed;
+    });
+    EXPECT_EQ(kinds, expected);
+}
+
+// An owner who moves directories about all the time: nothing outside is ever visited or changed.
+TEST(TreeWalker, StaysInATreeThatIsMovedAbout) {
+    World world;
+    std::set<ino_t> forbidden;
+    TreeWalker(WalkStatus::full).walk(world.fd(), "outside", [&](const WalkEntry& entry) {
+        forbidden.insert(entry.status.st_ino);
+        return WalkStep::proceed;
+    });
+    const support::ProcessResources before;
+    world.makeTree();
+    std::size_t walks = 0;
+    std::size_t disturbed = 0;
+    {
+        const Vandal vandal(world);
+        const auto end = std::chrono::steady_clock::now() + raceTime();
+        for (; std::chrono::steady_clock::now() < end; ++walks) {
+            TreeWalker walker;
+            std::size_t deepest = 0;
+            walker.walk(world.fd(), "tree", [&](const WalkEntry& entry) {
+                EXPECT_FALSE(forbidden.contains(entry.status.st_ino)) << entry.path();
+                if (entry.directory >= 0)
+                    ::fchmod(entry.directory, 0711);
+                deepest = std::max(deepest, entry.depth);
+                return WalkStep::proceed;
+            });
+            disturbed += walker.vanishedDirectories() > 0 || deepest < World::chainDepth ? 1 : 0;
+        }
+    }
+    EXPECT_EQ(world.damage(), "");
+    EXPECT_EQ(before.leakedSince(), "");
+    // Else the owner did not get in between, and the test says nothing.
+    EXPECT_GT(disturbed, 0U) << walks << " walks";
+}
+
+// Directories beyond the number of descriptors and beyond any path: all visited, with few descriptors.
+TEST(TreeWalker, WalksAnyDepth) {
+    constexpr std::size_t depth = 100'000;
+    const TemporaryDirectory directory;
+    const FileDescriptor root = openDirectory(AT_FDCWD, directory.path());
+    makeChain(root.get(), depth);
+    std::size_t visited = 0;
+    std::size_t descriptorsMost = 0;
+    const std::size_t descriptorsBefore = openDescriptorCount();
+    TreeWalker walker;
+    EXPECT_EQ(walker.walk(root.get(), "d",
+                          [&](const WalkEntry&) {
+                              if (++visited % 1000 == 0)
+                                  descriptorsMost = std::max(descriptorsMost, openDescriptorCount());
+                              return WalkStep::proceed;
+                          }),
+              0);
+    EXPECT_EQ(visited, 3 * depth);
+    EXPECT_EQ(walker.vanishedDirectories(), 0U);
+    EXPECT_LE(descriptorsMost - descriptorsBefore, 64U);
+    platform::LinuxDisk disk;
+    EXPECT_EQ(removeTree(disk, root.get(), "d"), 0);
+}
+
+// Mount points, of another file system and of this one (a loop), and a mount on a file: shown, not entered.
+TEST(TreeWalker, DoesNotCrossMounts) {
+    World world;
+    makeDirectory(world.fd(), "tree");
+    makeDirectory(world.fd(), "tree/other");
+    makeDirectory(world.fd(), "tree/loop");
+    makeFile(world.fd(), "tree/file");
+    const auto complaint = inMountNamespace([&]() -> std::string {
+        const std::string tree = world.path() + "/tree";
+        if (::mount("none", (tree + "/other").c_str(), "tmpfs", 0, nullptr) != 0 ||
+            ::mount(tree.c_str(), (tree + "/loop").c_str(), nullptr, MS_BIND, nullptr) != 0 ||
+            ::mount("/proc/version", (tree + "/file").c_str(), nullptr, MS_BIND, nullptr) != 0)
+            return "mount failed";
+        makeFile(AT_FDCWD, tree + "/other/inside");
+        // A descriptor from before belongs to the parent's mounts.
+        const FileDescriptor root = openDirectory(AT_FDCWD, world.path());
+        TreeWalker walker;
+        std::string seen;
+        for (const std::string& visit : visits(walker, root.get(), "tree"))
+            seen += visit + "; ";
+        const std::string expected = "directory ; directory loop (away); directory other (away); end ; "
+                                     "end loop (away); end other (away); file file (away); ";
+        return seen == expected ? "" : seen;
+    });
+    if (!complaint)
+        GTEST_SKIP() << "mounting is not permitted";
+    EXPECT_EQ(*complaint, "");
+}
+
+/// Resident memory in bytes.
+std::size_t residentBytes() {
+    const FileDescriptor fd(::open("/proc/self/statm", O_RDONLY | O_CLOEXEC));
+    char buffer[128] = {};
+    [[maybe_unused]] const ssize_t count = ::read(fd.get(), buffer, sizeof buffer - 1);
+    unsigned long pages = 0;
+    std::sscanf(buffer, "%*u %lu", &pages);
+    return pages * static_cast<std::size_t>(::sysconf(_SC_PAGESIZE));
+}
+
+// A directory with very many names: each visited once and then removed, without keeping them in memory.
+TEST(TreeWalker, WalksAnyWidth) {
+    const std::size_t width = isLongRun() ? 1'000'000 : 100'000;
+    const TemporaryDirectory directory;
+    const FileDescriptor root = openDirectory(AT_FDCWD, directory.path());
+    makeDirectory(root.get(), "wide");
+    const FileDescriptor wide = openDirectory(root.get(), "wide");
+    for (std::size_t i = 0; i < width; ++i)
+        ASSERT_EQ(::mknodat(wide.get(), ("name-" + std::to_string(i)).c_str(), S_IFREG | 0600, 0), 0);
+    const std::size_t residentBefore = residentBytes();
+    std::size_t files = 0;
+    TreeWalker walker;
+    walker.walk(root.get(), "wide", [&](const WalkEntry& entry) {
+        files += entry.kind == WalkEntryKind::file ? 1 : 0;
+        return WalkStep::proceed;
+    });
+    EXPECT_EQ(files, width);
+    platform::LinuxDisk disk;
+    EXPECT_EQ(removeTree(disk, root.get(), "wide"), 0);
+    EXPECT_FALSE(exists(root.get(), "wide"));
+    EXPECT_LT(residentBytes(), residentBefore + 4 * 1024 * 1024);
+}
+
+} // namespace
+} // namespace zor::fs::test
