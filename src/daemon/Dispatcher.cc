@@ -9,6 +9,9 @@ namespace powers = platform::entitlementKeys;
 
 namespace {
 
+/// What lines of the per-message handler are written under, whichever function writes them.
+constexpr const char* handlerName = "ZORProcessIpsiEvent";
+
 const std::string* identifierOf(const platform::Identity& identity) {
     return identity.grant && identity.grant->identifier ? &*identity.grant->identifier : nullptr;
 }
@@ -40,12 +43,13 @@ bool Dispatcher::serve(platform::PeerConnection& connection, platform::ServiceEv
     ErrorCode error = ErrorCode::success;
     const std::uint64_t command = event.request.unsignedInteger(ipc::keys::command).value_or(0);
     if (command >= commandTable.size()) {
-        ZOR_LOG(log_, logLevelError, "Invalid command index: %lld", static_cast<long long>(command));
+        log_.write(logLevelError, handlerName, "Invalid command index: %lld", static_cast<long long>(command));
         return false;
     }
     const ZORCommandTableRow& row = commandTable[command];
     if (static_cast<std::uint64_t>(row.command) != command) {
-        ZOR_LOG(log_, logLevelError, "Invalid command at index %llu", static_cast<unsigned long long>(command));
+        log_.write(logLevelError, handlerName, "Invalid command at index %llu",
+                   static_cast<unsigned long long>(command));
         return false;
     }
     const platform::Identity identity = connection.peer().identify(platform::Peer::Explain::no);
@@ -53,7 +57,7 @@ bool Dispatcher::serve(platform::PeerConnection& connection, platform::ServiceEv
     if (!client)
         return false;
     if (!event.reply) {
-        log_.write(logLevelError, "ZORProcessIpsiEvent", "Dictionary does not have reply context");
+        log_.write(logLevelError, handlerName, "Dictionary does not have reply context");
         return false;
     }
     plist::Dictionary reply;
