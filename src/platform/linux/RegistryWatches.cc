@@ -82,22 +82,24 @@ RegistryWatches::Interest* RegistryWatches::watch(int directory, std::uint32_t e
 }
 
 void RegistryWatches::watchRegistry() {
-    // etc, etc/zorvane, etc/zorvane/identities.d: each may come later than the daemon.
+    // The root, etc, etc/zorvane, etc/zorvane/identities.d: each but the first may come later than the daemon.
     const std::string_view whole = names::identityDirectory;
-    for (std::size_t end = whole.find('/');; end = whole.find('/', end + 1)) {
-        const auto directory =
-            openBeneath(root_.descriptor(), std::string(whole.substr(0, end)).c_str(), O_PATH | O_DIRECTORY);
+    std::string path = ".";
+    for (std::size_t next = 0;;) {
+        const auto directory = openBeneath(root_.descriptor(), path.c_str(), O_PATH | O_DIRECTORY);
         if (!directory)
             return;
-        const bool isLast = end == std::string_view::npos;
+        const bool isLast = next == std::string_view::npos;
         Interest* const interest = watch(directory->get(), isLast ? contentEvents : nameEvents, Noticed::registry);
-        if (interest && isLast)
-            interest->everything = true;
+        if (interest)
+            interest->everything = isLast;
         if (isLast)
             return;
-        const std::string_view rest = whole.substr(end + 1);
+        const std::size_t slash = whole.find('/', next);
         if (interest)
-            interest->names.emplace(rest.substr(0, rest.find('/')));
+            interest->names.emplace(whole.substr(next, slash - next));
+        path = whole.substr(0, slash);
+        next = slash == std::string_view::npos ? slash : slash + 1;
     }
 }
 

@@ -1,0 +1,114 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "platform/linux/IdentityFile.h"
+#include "platform/linux/CgroupUnit.h"
+
+#include <gtest/gtest.h>
+
+namespace zor::platform {
+namespace {
+
+std::string file(const std::string& body) {
+    return "<plist version=\"1.0\"><dict>" + body + "</dict></plist>";
+}
+
+std::expected<RegistryEntry, std::string> parse(const std::string& text) {
+    return parseIdentityFile({reinterpret_cast<const std::uint8_t*>(text.data()), text.size()});
+}
+
+const std::string executable = "<key>Executable</key><string>/usr/bin/agent</string>";
+
+// Goal: a file that is not wholly understood grants nothing. Method: one fault a row in a file that is otherwise good.
+TEST(IdentityFile, RefusesWhatItDoesNotUnderstand) {
+    ASSERT_TRUE(parse(file(executable)));
+    const std::vector<std::string> wrong = {
+        "",
+        "not a property list",
+        "<plist version=\"1.0\"><array/></plist>",
+        "<plist version=\"1.0\"><string>/usr/bin/agent</string></plist>",
+        file(""),
+        file("<key>Executable</key><string>agent</string>"),
+        file("<key>Executable</key><string></string>"),
+        file("<key>Executable</key><integer>1</integer>"),
+        file("<key>Executable</key><array><string>/a</string></array>"),
+        file(executable + "<key>Identifier</key><string></string>"),
+        file(executable + "<key>Identifier</key><true/>"),
+        file(executable + "<key>UserIDs</key><integer>501</integer>"),
+        file(executable + "<key>UserIDs</key><array><string>501</string></array>"),
+        file(executable + "<key>UserIDs</key><array><integer>-1</integer></array>"),
+        file(executable + "<key>UserIDs</key><array><integer>4294967295</integer></array>"),
+        file(executable + "<key>UserIDs</key><array><integer>18446744073709551615</integer></array>"),
+        file(executable + "<key>Unit</key><array/>"),
+        file(executable + "<key>Unit</key><string></string>"),
+        file(executable + "<key>SecurityLabel</key><true/>"),
+        file(executable + "<key>Entitlements</key><array/>"),
+        file(executable + "<key>KernelAgent</key><integer>1</integer>"),
+        // A fence with a typing mistake must not be a fence that is not there.
+        file(executable + "<key>UserIds</key><array><integer>501</integer></array>"),
+        file(executable + "<key>Executable </key><string>/b</string>"),
+    };
+    for (const std::string& text : wrong) {
+        const auto entry = parse(text);
+        EXPECT_FALSE(entry) << text;
+        EXPECT_TRUE(entry || !entry.error().empty());
+    }
+}
+
+// Goal: power needs a uid that was named, or the owner's. Method: what is granted, by which uids get it.
+TEST(IdentityFile, FencesPowers) {
+    const std::string prefix = "com.veltra.private.Zorvane.";
+    const auto entitled = [&](const std::string& key, const std::string& value) {
+        return "<key>Entitlements</key><dict><key>" + key + "</key>" + value + "</dict>";
+    };
+    struct Case {
+        std::string body;
+        bool admitsOwner;
+        bool admits501;
+    };
+    const std::string named = "<key>UserIDs</key><array><integer>501</integer></array>";
+    const std::vector<Case> cases = {
+        {"", true, true},
+        {"<key>Identifier</key><string>com.veltra.app</string>", true, true},
+        {entitled(prefix + "allowed", "<true/>"), true, false},
+        {entitled(prefix + "allowed", "<false/>"), true, true},
+        {entitled(prefix + "allowed", "<integer>1</integer>"), true, true},
+        {entitled(prefix + "otherIdLookup", "<true/>"), true, false},
+        {entitled(prefix + "wipeContainer", "<array/>"), true, false},
+        {entitled(prefix + "wipeContainer", "<true/>"), true, true},
+        {entitled("com.veltra.security.application-groups", "<array/>"), true, true},
+        {"<key>KernelAgent</key><true/>", true, false},
+        {"<key>KernelAgent</key><false/>", true, true},
+        {entitled(prefix + "allowed", "<true/>") + named, false, true},
+        {named, false, true},
+        {"<key>UserIDs</key><array/>", false, false},
+    };
+    for (const Case& row : cases) {
+        const auto entry = parse(file(executable + row.body));
+        ASSERT_TRUE(entry) << row.body << entry.error();
+        EXPECT_EQ(entry->admitsUser(0), row.admitsOwner) << row.body;
+        EXPECT_EQ(entry->admitsUser(501), row.admits501) << row.body;
+    }
+}
+
+// Goal: only a unit of the system manager counts. Method: paths as the kernel writes them, and those a user can bring
+// about.
+TEST(CgroupUnit, IsTheSystemManagersUnit) {
+    const std::vector<std::pair<std::string, std::string>> cases = {
+        {"0::/system.slice/installer.service\n", "installer.service"},
+        {"0::/system.slice/system-x.slice/x@1.service/inner/deeper\n", "x@1.service"},
+        {"0::/user.slice/user-501.slice/user@501.service/app.slice/installer.service\n", "user@501.service"},
+        {"0::/user.slice/user-501.slice/session-1.scope/installer.service\n", "session-1.scope"},
+        {"0::/\n", ""},
+        {"0::/../system.slice/installer.service\n", ".."},
+        {"0::/system.slice/_cpu.service\n", "cpu.service"},
+        {"12:cpu:/system.slice/a.service\n1:name=systemd:/system.slice/b.service\n0::/\n", "b.service"},
+        {"1:cpu,name=other:/system.slice/installer.service\n", ""},
+        {"0:/system.slice/installer.service\n", ""},
+        {"", ""},
+        {"0::/system.slice", ""},
+    };
+    for (const auto& [text, unit] : cases)
+        EXPECT_EQ(systemUnitInCgroups(text), unit) << text;
+}
+
+} // namespace
+} // namespace zor::platform

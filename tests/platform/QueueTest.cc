@@ -1,0 +1,172 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "platform/TestRoot.h"
+#include "platform/linux/EpollRunLoop.h"
+#include "platform/linux/SerialWorkQueue.h"
+#include "platform/linux/SignalDescriptor.h"
+
+#include <algorithm>
+#include <atomic>
+#include <csignal>
+#include <sched.h>
+#include <sys/eventfd.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+#include <vector>
+
+namespace zor::platform {
+namespace {
+
+// Goal: jobs run one at a time, in order, whoever queues them. Method: threads that queue; each job looks for another
+// one inside.
+TEST(SerialWorkQueue, RunsOneAtATimeInOrder) {
+    std::atomic<int> inside{0};
+    std::vector<std::vector<int>> seen(4);
+    {
+        SerialWorkQueue queue("com.veltra.test");
+        std::vector<std::thread> threads;
+        for (int t = 0; t < 4; ++t)
+            threads.emplace_back([&, t] {
+                for (int i = 0; i < 500; ++i)
+                    queue.async([&, t, i] {
+                        EXPECT_EQ(inside.fetch_add(1), 0);
+                        seen[static_cast<std::size_t>(t)].push_back(i);
+                        inside.fetch_sub(1);
+                    });
+            });
+        for (std::thread& thread : threads)
+            thread.join();
+    }
+    for (const auto& ofThread : seen) {
+        ASSERT_EQ(ofThread.size(), 500U);
+        EXPECT_TRUE(std::ranges::is_sorted(ofThread));
+    }
+}
+
+// Goal: no job begins after suspend has returned, and all that wait run after resume. Method: again and again under
+// load; of the five that are queued, the one that was just running may still end.
+TEST(SerialWorkQueue, BeginsNothingWhileSuspended) {
+    std::atomic<int> ran{0};
+    SerialWorkQueue queue("com.veltra.test");
+    for (int round = 1; round <= 100; ++round) {
+        for (int i = 0; i < 5; ++i)
+            queue.async([&] { ++ran; });
+        queue.suspend();
+        const int before = ran.load();
+        std::this_thread::sleep_for(std::chrono::microseconds(200));
+        const int after = ran.load();
+        EXPECT_LE(after, before + 1);
+        queue.async([&] { ++ran; });
+        std::this_thread::sleep_for(std::chrono::microseconds(200));
+        EXPECT_EQ(ran.load(), after);
+        queue.resume();
+        ASSERT_TRUE(eventually([&] { return ran.load() == round * 6; }));
+    }
+}
+
+// Goal: what happens to queued jobs when the queue goes. Method: one that runs them, with jobs that queue more; one
+// that is suspended drops them; in both cases nothing that a job holds is left.
+TEST(SerialWorkQueue, FinishesOrDropsWhatIsQueued) {
+    const auto held = std::make_shared<int>(0);
+    std::atomic<int> ran{0};
+    {
+        SerialWorkQueue queue("com.veltra.test");
+        for (int i = 0; i < 10; ++i)
+            queue.async([&, held] { queue.async([&, held] { ++ran; }); });
+        queue.finish();
+        EXPECT_EQ(ran.load(), 10);
+        queue.async([&, held] { ++ran; });
+    }
+    EXPECT_EQ(ran.load(), 10);
+    {
+        SerialWorkQueue queue("com.veltra.test");
+        queue.suspend();
+        for (int i = 0; i < 10; ++i)
+            queue.async([&, held] { ++ran; });
+    }
+    EXPECT_EQ(ran.load(), 10);
+    EXPECT_EQ(held.use_count(), 1);
+}
+
+// Goal: the background queue stands behind everything else, and its thread can be told from others.
+TEST(SerialWorkQueue, BackgroundIsIdle) {
+    int policy = -1;
+    long ioPriority = -1;
+    char name[16] = {};
+    {
+        SerialWorkQueue queue("com.veltra.zorvaned.deathrow", WorkQueue::Priority::background);
+        queue.async([&] {
+            policy = ::sched_getscheduler(0);
+            ioPriority = ::syscall(SYS_ioprio_get, 1, 0);
+            ::pthread_getname_np(::pthread_self(), name, sizeof name);
+        });
+    }
+    EXPECT_EQ(policy, SCHED_IDLE);
+    EXPECT_EQ(ioPriority >> 13, 3);
+    EXPECT_STREQ(name, "deathrow");
+}
+
+// Goal: callbacks and posted jobs run on the loop's thread; a callback that unwatches another one whose event is
+// already fetched prevents it; a descriptor number that is used again is not mistaken for the old one.
+TEST(EpollRunLoop, CallsOnlyWhatIsStillWatched) {
+    EpollRunLoop loop;
+    FileDescriptor first(::eventfd(1, EFD_CLOEXEC | EFD_NONBLOCK));
+    FileDescriptor second(::eventfd(1, EFD_CLOEXEC | EFD_NONBLOCK));
+    std::vector<std::string> calls;
+    const auto onlyOnce = [&](const char* name, FileDescriptor& other) {
+        return [&, name] {
+            calls.emplace_back(name);
+            loop.unwatch(other.get());
+            other.reset();
+            other.reset(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
+            EXPECT_TRUE(loop.watch(other.get(), [&] { calls.emplace_back("wrong"); }));
+            loop.post([&] { loop.stop(); });
+        };
+    };
+    ASSERT_TRUE(loop.watch(first.get(), onlyOnce("first", second)));
+    ASSERT_TRUE(loop.watch(second.get(), onlyOnce("second", first)));
+    loop.run();
+    ASSERT_EQ(calls.size(), 1U);
+    EXPECT_TRUE(calls.front() == "first" || calls.front() == "second");
+    EXPECT_FALSE(loop.watch(-1, [] {}));
+}
+
+// Goal: posting and stopping from other threads loses nothing. Method: threads that post; the last job stops.
+TEST(EpollRunLoop, TakesJobsFromAnyThread) {
+    EpollRunLoop loop;
+    const auto loopThread = std::this_thread::get_id();
+    int ran = 0;
+    std::vector<std::thread> threads;
+    for (int t = 0; t < 4; ++t)
+        threads.emplace_back([&] {
+            for (int i = 0; i < 500; ++i)
+                loop.post([&] {
+                    EXPECT_EQ(std::this_thread::get_id(), loopThread);
+                    if (++ran == 2000)
+                        loop.stop();
+                });
+        });
+    loop.run();
+    for (std::thread& thread : threads)
+        thread.join();
+    EXPECT_EQ(ran, 2000);
+    loop.stop();
+    loop.run();
+}
+
+TEST(SignalDescriptor, HandsSignalsToTheLoop) {
+    SignalDescriptor signals({SIGUSR2});
+    ASSERT_GE(signals.get(), 0);
+    EXPECT_EQ(signals.take(), std::nullopt);
+    EpollRunLoop loop;
+    std::optional<int> taken;
+    ASSERT_TRUE(loop.watch(signals.get(), [&] {
+        taken = signals.take();
+        loop.stop();
+    }));
+    ASSERT_EQ(::pthread_kill(::pthread_self(), SIGUSR2), 0);
+    loop.run();
+    EXPECT_EQ(taken, SIGUSR2);
+}
+
+} // namespace
+} // namespace zor::platform
