@@ -126,6 +126,8 @@ TEST(BinaryForm, RefusesToWrite) {
         std::string("\xC3"),             // cut off
         std::string("a\x80"),            // no lead
         std::string("\xC0\xAF"),         // overlong
+        std::string("\xE0\x9F\xBF"),     // overlong, of three
+        std::string("\xF0\x8F\xBF\xBF"), // overlong, of four
         std::string("\xED\xA0\x80"),     // a surrogate
         std::string("\xF4\x90\x80\x80"), // above the last character
         std::string("a\0b", 3),          // NUL

@@ -100,6 +100,7 @@ TEST(BinaryHostile, RefusedWithAReason) {
         {"UTF-16 cut off", assemble({{0x62, 0, 'a', 0}}), "cut off"},
         {"UTF-16 whose bytes overflow", assemble({{0x6F, 0x13, 0x80, 0, 0, 0, 0, 0, 0, 0}}), "cut off"},
         {"high surrogate at the end", assemble({{0x61, 0xD8, 0x00}}), "surrogate"},
+        {"high surrogate before another object", assemble({{0x61, 0xD8, 0x00}, {0xDC, 0x00}}), "surrogate"},
         {"high surrogate before a letter", assemble({{0x62, 0xD8, 0x00, 0x00, 'a'}}), "surrogate"},
         {"low surrogate first", assemble({{0x62, 0xDC, 0x00, 0xD8, 0x00}}), "surrogate"},
         {"array cut off", assemble({{0xA2, 0}}), "cut off"},
@@ -190,6 +191,11 @@ TEST(BinaryHostile, SystematicDamage) {
 TEST(BinaryHostile, OffsetsAnywhere) {
     Data bytes = assemble({{0xA2, 1, 1}, {0x5E}, bytesOf("\xD1\xA1\x4F\x10\x33\x23\x13\x61?????")}, {.offsetWidth = 2});
     const std::size_t table = bytes.size() - 32 - 6;
+    // The table's first byte would be an object by itself: its own place, 9, is the marker of true.
+    Data atTable = assemble({{0x08}});
+    ASSERT_EQ(atTable[9], 8);
+    atTable[9] = 9;
+    EXPECT_FALSE(readWatched(atTable));
     for (std::size_t offset = 0; offset <= 0xFFFF; ++offset) {
         bytes[table] = static_cast<std::uint8_t>(offset >> 8);
         bytes[table + 1] = static_cast<std::uint8_t>(offset);
