@@ -32,7 +32,7 @@ if(ZORVANE_TIDY)
     set(ZORVANE_PCH OFF)
 endif()
 if(ZORVANE_PCH)
-    file(WRITE ${CMAKE_BINARY_DIR}/pch.cc "")
+    file(CONFIGURE OUTPUT ${CMAKE_BINARY_DIR}/pch.cc CONTENT "")
     add_library(zor_pch STATIC ${CMAKE_BINARY_DIR}/pch.cc)
     target_link_libraries(zor_pch PRIVATE zor_options)
     target_precompile_headers(zor_pch PRIVATE <algorithm> <atomic> <condition_variable> <deque> <expected> <functional>
