@@ -22,8 +22,9 @@ struct Rule {
     const char* instead;
 };
 
-const std::vector<std::string> kernelFolders = {"src/fs/", "src/platform/linux/"};
-const std::vector<std::string> diskFolders = {"src/platform/linux/"};
+// Clients and tools run with their user's own rights, on their user's own paths.
+const std::vector<std::string> kernelFolders = {"src/fs/", "src/platform/linux/", "client/", "tools/"};
+const std::vector<std::string> diskFolders = {"src/platform/linux/", "client/", "tools/"};
 const std::vector<std::string> lockHeader = {"src/platform/Mutex.h"};
 // Locks that are looked up by identifier are beyond what the analysis can follow.
 const std::vector<std::string> sharedLocks = {"src/platform/Mutex.h", "src/daemon/base/ZORLocks"};
