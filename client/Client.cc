@@ -1,0 +1,157 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "zorvane/Client.h"
+
+#include "Connection.h"
+#include "ipc/ContainerClasses.h"
+#include "ipc/Keys.h"
+#include "ipc/Uuid.h"
+
+#include <charconv>
+
+namespace zorvane {
+
+namespace ipc = zor::ipc;
+namespace keys = zor::ipc::keys;
+namespace plist = zor::plist;
+
+namespace {
+
+plist::Dictionary request(ipc::Command command) {
+    return {{std::string(keys::command), static_cast<std::uint64_t>(command)}};
+}
+
+std::unexpected<Error> incomplete() {
+    return std::unexpected(Error{.kind = Error::Kind::protocol, .code = 0, .message = "the reply is incomplete"});
+}
+
+Value converted(const plist::Value& value);
+
+Map converted(const plist::Dictionary& dictionary) {
+    Map map;
+    for (const auto& [key, value] : dictionary)
+        map.emplace(key, converted(value));
+    return map;
+}
+
+Value converted(const plist::Value& value) {
+    if (const bool* boolean = value.asBoolean())
+        return {*boolean};
+    if (const auto number = value.asSigned())
+        return {*number};
+    if (const auto number = value.asUnsigned())
+        return {*number};
+    if (const double* real = value.asReal())
+        return {*real};
+    if (const std::string* text = value.asString())
+        return {*text};
+    if (const plist::Dictionary* dictionary = value.asDictionary())
+        return {converted(*dictionary)};
+    if (const plist::Array* array = value.asArray()) {
+        List list;
+        for (const plist::Value& element : *array)
+            list.push_back(converted(element));
+        return {std::move(list)};
+    }
+    return {plist::describe(&value)}; // dates and data, for people
+}
+
+} // namespace
+
+std::optional<std::uint64_t> containerClassOf(std::string_view nameOrNumber) {
+    std::uint64_t number = 0;
+    const char* end = nameOrNumber.data() + nameOrNumber.size();
+    const auto [parsedTo, failure] = std::from_chars(nameOrNumber.data(), end, number);
+    if (failure == std::errc() && parsedTo == end)
+        return ipc::isContainerClass(number) ? std::optional(number) : std::nullopt;
+    const auto named = ipc::containerClassOfName(nameOrNumber);
+    return named ? std::optional(static_cast<std::uint64_t>(*named)) : std::nullopt;
+}
+
+std::string_view containerClassName(std::uint64_t number) {
+    return ipc::containerClassNames[ipc::isContainerClass(number) ? number : 0];
+}
+
+std::uint32_t defaultUserOfClass(std::uint64_t number) {
+    const auto containerClass = static_cast<ipc::ContainerClass>(number);
+    if (ipc::isBundleClass(containerClass))
+        return ipc::bundleUserId;
+    return ipc::isSystemClass(containerClass) ? ipc::systemUserId : currentMobileUser;
+}
+
+std::string uuidText(const std::array<std::uint8_t, 16>& uuid) { return ipc::uuidText(uuid); }
+
+Client::Client(std::unique_ptr<Connection> connection) : connection_(std::move(connection)) {}
+Client::Client(Client&&) noexcept = default;
+Client& Client::operator=(Client&&) noexcept = default;
+Client::~Client() = default;
+
+Result<Client> Client::connect(const ConnectOptions& options) {
+    auto connection = Connection::open(options, Connection::Service::commands);
+    if (!connection)
+        return std::unexpected(connection.error());
+    return Client(std::make_unique<Connection>(std::move(*connection)));
+}
+
+Result<Container> Client::createOrLookup(const Lookup& lookup) {
+    plist::Dictionary message = request(ipc::Command::createOrLookupContainer);
+    message.set(keys::containerClass, lookup.containerClass);
+    message.set(keys::userId, lookup.user);
+    if (!lookup.identifier.empty())
+        message.set(keys::identifier, lookup.identifier);
+    message.set(keys::createIfNecessary, lookup.create);
+    message.set(keys::transient, lookup.transient);
+    const auto reply = connection_->call(message);
+    if (!reply)
+        return std::unexpected(reply.error());
+    const auto uuid = ipc::uuidOf(*reply, keys::replyUUID);
+    const std::string* identifier = reply->string(keys::replyIdentifier);
+    const std::string* path = reply->string(keys::replyPath);
+    if (!uuid || !identifier || !path)
+        return incomplete();
+    return Container{
+        .uuid = *uuid, .identifier = *identifier, .path = *path, .existed = reply->isTrue(keys::replyExisted)};
+}
+
+Result<std::vector<ListedContainer>> Client::list(std::uint64_t containerClass, std::uint32_t user, bool transient) {
+    plist::Dictionary message = request(ipc::Command::listContainers);
+    message.set(keys::containerClass, containerClass);
+    message.set(keys::userId, user);
+    message.set(keys::transient, transient);
+    const auto reply = connection_->call(message);
+    if (!reply)
+        return std::unexpected(reply.error());
+    const plist::Array* identifiers = reply->array(keys::replyIdsArray);
+    const plist::Array* uuids = reply->array(keys::replyUUIDsArray);
+    if (!identifiers || !uuids || identifiers->size() != uuids->size())
+        return incomplete();
+    std::vector<ListedContainer> containers;
+    containers.reserve(identifiers->size());
+    for (std::size_t i = 0; i < identifiers->size(); ++i) {
+        const std::string* identifier = (*identifiers)[i].asString();
+        const auto uuid = ipc::uuidOf(&(*uuids)[i]);
+        if (!identifier || !uuid)
+            return incomplete();
+        containers.push_back({.uuid = *uuid, .identifier = *identifier});
+    }
+    return containers;
+}
+
+Result<void> Client::emptyDeathRow() {
+    const auto reply = connection_->call(request(ipc::Command::deleteContainersOnDeathRow));
+    if (!reply)
+        return std::unexpected(reply.error());
+    return {};
+}
+
+Result<Value> status(const ConnectOptions& options) {
+    auto connection = Client::Connection::open(options, Client::Connection::Service::status);
+    if (!connection)
+        return std::unexpected(connection.error());
+    connection->startTime();
+    const auto reply = connection->receive();
+    if (!reply)
+        return std::unexpected(reply.error());
+    return Value{converted(reply->content)};
+}
+
+} // namespace zorvane

@@ -1,0 +1,174 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "Connection.h"
+
+#include "ipc/Frame.h"
+#include "ipc/Keys.h"
+#include "ipc/Names.h"
+#include "plist/Binary.h"
+
+#include <cerrno>
+#include <cstring>
+#include <fcntl.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+
+namespace zorvane {
+
+using zor::platform::FileDescriptor;
+namespace ipc = zor::ipc;
+namespace plist = zor::plist;
+
+namespace {
+
+std::unexpected<Error> fail(Error::Kind kind, std::string message) {
+    return std::unexpected(Error{.kind = kind, .code = 0, .message = std::move(message)});
+}
+
+std::string withReason(const std::string& what, int number) {
+    const char* reason = strerrordesc_np(number);
+    return what + ": " + (reason ? reason : "unknown error");
+}
+
+/// The address of a socket in `directory`; through the open directory when the path is too long for one.
+sockaddr_un addressOf(const std::string& path, const std::string& name, int directory) {
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::string text = path;
+    if (text.size() >= sizeof address.sun_path)
+        text = "/proc/self/fd/" + std::to_string(directory) + "/" + name;
+    std::memcpy(address.sun_path, text.data(), std::min(text.size(), sizeof address.sun_path - 1));
+    return address;
+}
+
+constexpr std::size_t replyBytesMax = std::size_t{1} << 30; // a list of every container of a large device takes a few MiB
+
+} // namespace
+
+Result<Client::Connection> Client::Connection::open(const ConnectOptions& options, Service service) {
+    const std::string name(service == Service::commands ? ipc::serviceName : ipc::statusSocketName);
+    std::string directoryPath = options.root;
+    if (directoryPath.empty() || directoryPath.back() != '/')
+        directoryPath += '/';
+    directoryPath += ipc::runtimeDirectory;
+    const std::string path = directoryPath + "/" + name;
+    const FileDescriptor directory(::open(directoryPath.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    if (!directory.valid())
+        return fail(Error::Kind::unreachable, withReason("cannot reach zorvaned at " + path, errno));
+    FileDescriptor socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    if (!socket.valid())
+        return fail(Error::Kind::unreachable, withReason("cannot make a socket", errno));
+    const sockaddr_un address = addressOf(path, name, directory.get());
+    if (::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0)
+        return fail(Error::Kind::unreachable, withReason("cannot reach zorvaned at " + path, errno));
+    return Connection(std::move(socket), options);
+}
+
+void Client::Connection::startTime() {
+    deadline_.reset();
+    if (timeoutMilliseconds_ != 0)
+        deadline_ = Clock::now() + std::chrono::milliseconds(timeoutMilliseconds_);
+}
+
+Result<void> Client::Connection::waitFor(short events) {
+    if (!deadline_)
+        return {}; // the blocking call that follows waits
+    for (;;) {
+        const auto left = std::chrono::ceil<std::chrono::milliseconds>(*deadline_ - Clock::now()).count();
+        pollfd descriptor{.fd = socket_.get(), .events = events, .revents = 0};
+        const int ready = left > 0 ? ::poll(&descriptor, 1, static_cast<int>(left)) : 0;
+        if (ready > 0)
+            return {};
+        if (ready == 0)
+            return fail(Error::Kind::timedOut, "zorvaned did not answer within " +
+                                                   std::to_string(timeoutMilliseconds_) + " ms");
+        if (errno != EINTR)
+            return fail(Error::Kind::unreachable, withReason("cannot wait for zorvaned", errno));
+    }
+}
+
+Result<std::uint64_t> Client::Connection::send(const plist::Dictionary& request) {
+    plist::Data frame(ipc::frameHeaderBytes);
+    if (const auto appended = plist::appendBinary(request, frame); !appended)
+        return fail(Error::Kind::protocol, std::string("the request cannot be sent: ") + appended.error().reason);
+    const std::size_t payloadBytes = frame.size() - ipc::frameHeaderBytes;
+    if (payloadBytes > ipc::requestPayloadBytesMax)
+        return fail(Error::Kind::protocol, "the request is too large");
+    const ipc::FrameHeader header{.payloadBytes = static_cast<std::uint32_t>(payloadBytes),
+                                  .flags = ipc::frameExpectsReply,
+                                  .id = ++lastId_};
+    ipc::encodeFrameHeader(header, std::span(frame).first<ipc::frameHeaderBytes>());
+    for (std::size_t sent = 0; sent < frame.size();) {
+        if (auto ready = waitFor(POLLOUT); !ready)
+            return std::unexpected(ready.error());
+        const ssize_t count = ::send(socket_.get(), frame.data() + sent, frame.size() - sent, MSG_NOSIGNAL);
+        if (count < 0 && errno == EINTR)
+            continue;
+        if (count < 0)
+            return fail(Error::Kind::refused, "zorvaned ended the connection: this program may not send the command");
+        sent += static_cast<std::size_t>(count);
+    }
+    return header.id;
+}
+
+Result<void> Client::Connection::readAll(std::uint8_t* bytes, std::size_t count) {
+    for (std::size_t have = 0; have < count;) {
+        if (auto ready = waitFor(POLLIN); !ready)
+            return ready;
+        const ssize_t got = ::recv(socket_.get(), bytes + have, count - have, 0);
+        if (got < 0 && errno == EINTR)
+            continue;
+        if (got <= 0)
+            return fail(Error::Kind::refused, "zorvaned ended the connection without an answer: this program is not "
+                                              "known to it, or may not send the command, or the daemon stopped");
+        have += static_cast<std::size_t>(got);
+    }
+    return {};
+}
+
+Result<Client::Connection::Reply> Client::Connection::receive() {
+    std::array<std::uint8_t, ipc::frameHeaderBytes> headerBytes{};
+    if (auto read = readAll(headerBytes.data(), headerBytes.size()); !read)
+        return std::unexpected(read.error());
+    const ipc::FrameHeader header = ipc::decodeFrameHeader(headerBytes);
+    if (!header.isValidReply() || header.payloadBytes > replyBytesMax)
+        return fail(Error::Kind::protocol, "what came back is no reply");
+    plist::Data payload(header.payloadBytes);
+    if (auto read = readAll(payload.data(), payload.size()); !read)
+        return std::unexpected(read.error());
+    auto value = plist::readBinary(payload);
+    plist::Dictionary* content = value ? value->asMutableDictionary() : nullptr;
+    if (!content)
+        return fail(Error::Kind::protocol, "what came back is no dictionary");
+    return Reply{.id = header.id, .content = std::move(*content)};
+}
+
+Result<plist::Dictionary> Client::Connection::replyTo(std::uint64_t id) {
+    for (;;) {
+        if (auto early = early_.extract(id))
+            return std::move(early.mapped());
+        auto reply = receive();
+        if (!reply)
+            return std::unexpected(reply.error());
+        early_.insert_or_assign(reply->id, std::move(reply->content));
+    }
+}
+
+Result<plist::Dictionary> Client::Connection::call(const plist::Dictionary& request) {
+    startTime();
+    const auto id = send(request);
+    if (!id)
+        return std::unexpected(id.error());
+    auto reply = replyTo(*id);
+    if (!reply)
+        return reply;
+    const auto code = reply->unsignedInteger(ipc::keys::replyError);
+    if (!code)
+        return fail(Error::Kind::protocol, "the reply has no \"ReplyError\"");
+    if (*code != ipc::replySuccess)
+        return std::unexpected(
+            Error{.kind = Error::Kind::daemon, .code = *code, .message = errorText(*code).meaning});
+    return reply;
+}
+
+} // namespace zorvane

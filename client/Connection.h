@@ -1,0 +1,51 @@
+// SPDX-License-Identifier: Apache-2.0
+// One stream to the daemon: requests out, replies in, told apart by their ids. One thread at a time.
+#pragma once
+
+#include "platform/FileDescriptor.h"
+#include "plist/Value.h"
+#include "zorvane/Client.h"
+
+#include <chrono>
+#include <cstdint>
+#include <map>
+#include <optional>
+#include <string_view>
+
+namespace zorvane {
+
+using Clock = std::chrono::steady_clock;
+
+class Client::Connection {
+public:
+    enum class Service { commands, status };
+    [[nodiscard]] static Result<Connection> open(const ConnectOptions& options, Service service);
+
+    /// Sends a request and waits for its reply; a "ReplyError" other than success is the error. Replies to other requests that
+    /// come first are kept.
+    [[nodiscard]] Result<zor::plist::Dictionary> call(const zor::plist::Dictionary& request);
+    /// The next frame, whatever its id.
+    struct Reply {
+        std::uint64_t id = 0;
+        zor::plist::Dictionary content;
+    };
+    [[nodiscard]] Result<Reply> receive();
+    /// Starts the time of a call.
+    void startTime();
+
+private:
+    Connection(zor::platform::FileDescriptor socket, const ConnectOptions& options)
+        : socket_(std::move(socket)), timeoutMilliseconds_(options.timeoutMilliseconds) {}
+    Result<std::uint64_t> send(const zor::plist::Dictionary& request);
+    Result<zor::plist::Dictionary> replyTo(std::uint64_t id);
+    Result<void> readAll(std::uint8_t* bytes, std::size_t count);
+    Result<void> waitFor(short events);
+
+    zor::platform::FileDescriptor socket_;
+    std::uint32_t timeoutMilliseconds_;
+    std::optional<Clock::time_point> deadline_;
+    std::uint64_t lastId_ = 0;
+    std::map<std::uint64_t, zor::plist::Dictionary> early_;
+};
+
+} // namespace zorvane

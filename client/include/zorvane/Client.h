@@ -1,0 +1,102 @@
+// SPDX-License-Identifier: Apache-2.0
+// The client of zorvaned, the container manager.
+//
+//     auto client = zorvane::Client::connect({});
+//     if (!client) … client.error().message …
+//     auto container = client->createOrLookup({.containerClass = 2, .identifier = "org.example.notes", .create = true});
+//
+// A Client is one connection and is used by one thread at a time; programs that call from several threads make several.
+// Calls block until the answer is there or their time is over. After a transport error (any kind but daemon) the connection is
+// of no more use: connect again. What a caller may do is decided by the daemon's identity registry.
+#pragma once
+
+#include "zorvane/Error.h"
+#include "zorvane/Value.h"
+
+#include <array>
+#include <cstdint>
+#include <expected>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace zorvane {
+
+template <typename T>
+using Result = std::expected<T, Error>;
+
+struct ConnectOptions {
+    /// The system root that the daemon works on.
+    std::string root = "/";
+    /// For each call; 0 waits for ever.
+    std::uint32_t timeoutMilliseconds = 0;
+};
+
+/// The user id in a request that stands for the current mobile user.
+inline constexpr std::uint32_t currentMobileUser = 1;
+
+/// Number of a class by its name ("Data/Application") or decimal number (1 to 13).
+[[nodiscard]] std::optional<std::uint64_t> containerClassOf(std::string_view nameOrNumber);
+/// Names of the classes; index is the number, index 0 is no class.
+[[nodiscard]] std::string_view containerClassName(std::uint64_t number);
+inline constexpr std::uint64_t containerClassMax = 13;
+/// The user that owns containers of a class when nobody is named: 33 for bundles, 499 for the system's, else the current one.
+[[nodiscard]] std::uint32_t defaultUserOfClass(std::uint64_t number);
+
+struct Container {
+    std::array<std::uint8_t, 16> uuid{}; // the container's identity, not its directory's name
+    std::string identifier;
+    std::string path;
+    /// It was there before this call.
+    bool existed = false;
+};
+
+struct ListedContainer {
+    std::array<std::uint8_t, 16> uuid{};
+    std::string identifier;
+};
+
+/// 36 characters, upper-case.
+[[nodiscard]] std::string uuidText(const std::array<std::uint8_t, 16>& uuid);
+
+class Client {
+public:
+    [[nodiscard]] static Result<Client> connect(const ConnectOptions& options);
+    Client(Client&&) noexcept;
+    Client& operator=(Client&&) noexcept;
+    ~Client();
+
+    struct Lookup {
+        std::uint64_t containerClass = 0;
+        std::uint32_t user = currentMobileUser;
+        /// Empty: the caller's own identifier.
+        std::string identifier;
+        /// Make the container when there is none.
+        bool create = false;
+        /// One that lasts until it is asked for again, or the next boot.
+        bool transient = false;
+    };
+    /// Code 21: there is none, and it was not to be made.
+    [[nodiscard]] Result<Container> createOrLookup(const Lookup& lookup);
+
+    /// In no particular order.
+    [[nodiscard]] Result<std::vector<ListedContainer>> list(std::uint64_t containerClass, std::uint32_t user,
+                                                            bool transient);
+
+    /// Deletes what is on death row, and returns when that is done. Other answers of this connection may come before.
+    [[nodiscard]] Result<void> emptyDeathRow();
+
+    /// The implementation's own.
+    class Connection;
+
+private:
+    explicit Client(std::unique_ptr<Connection> connection);
+    std::unique_ptr<Connection> connection_;
+};
+
+/// Whom the daemon takes this program for, and why ("Peer"); for the owner of the root also how it is doing ("Counters").
+[[nodiscard]] Result<Value> status(const ConnectOptions& options);
+
+} // namespace zorvane

@@ -1,0 +1,37 @@
+// SPDX-License-Identifier: Apache-2.0
+// What a call to the container manager can fail with.
+#pragma once
+
+#include <cstdint>
+#include <string>
+
+namespace zorvane {
+
+struct Error {
+    enum class Kind {
+        /// The daemon cannot be reached: not running, another root, no permission, or it stopped meanwhile.
+        unreachable,
+        /// The daemon ended the connection instead of answering: this program may not send the command.
+        refused,
+        /// The time given to the call ran out. The command may still be carried out.
+        timedOut,
+        /// What came back makes no sense.
+        protocol,
+        /// The daemon answered with an error code.
+        daemon,
+    };
+    Kind kind = Kind::protocol;
+    /// The daemon's code; 0 unless kind is daemon.
+    std::uint64_t code = 0;
+    /// One sentence for people, without a full stop.
+    std::string message;
+};
+
+/// What a code of the daemon means, and what to do about it. Static strings, never null.
+struct ErrorText {
+    const char* meaning;
+    const char* advice;
+};
+[[nodiscard]] ErrorText errorText(std::uint64_t code);
+
+} // namespace zorvane

@@ -1,0 +1,134 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "Output.h"
+
+#include <algorithm>
+#include <cstdio>
+
+namespace zorvanectl {
+
+namespace {
+
+// Names are bytes; what is not UTF-8 is shown as a replacement character rather than ending the program.
+std::string dumped(const nlohmann::json& document) {
+    return document.dump(2, ' ', false, nlohmann::json::error_handler_t::replace);
+}
+
+const char* kindName(zorvane::Error::Kind kind) {
+    using Kind = zorvane::Error::Kind;
+    switch (kind) {
+    case Kind::unreachable:
+        return "unreachable";
+    case Kind::refused:
+        return "refused";
+    case Kind::timedOut:
+        return "timed-out";
+    case Kind::protocol:
+        return "protocol";
+    case Kind::daemon:
+        return "daemon";
+    }
+    return "unknown";
+}
+
+const char* adviceFor(const zorvane::Error& error) {
+    using Kind = zorvane::Error::Kind;
+    switch (error.kind) {
+    case Kind::unreachable:
+        return "start the daemon (systemctl start zorvaned), or name its root with --root";
+    case Kind::refused:
+        return "'zorvanectl status' shows whom the daemon takes this program for; "
+               "programs are named in etc/zorvane/identities.d";
+    case Kind::timedOut:
+        return "look at the daemon's log, or wait longer with --timeout";
+    case Kind::protocol:
+        return "check that client and daemon are of one version";
+    case Kind::daemon:
+        return zorvane::errorText(error.code).advice;
+    }
+    return "";
+}
+
+int exitCodeOf(const zorvane::Error& error) {
+    return error.kind == zorvane::Error::Kind::daemon ? exitDaemonError : exitUnreachable;
+}
+
+} // namespace
+
+std::string printable(const std::string& text) {
+    std::string shown;
+    for (const char character : text) {
+        const auto byte = static_cast<unsigned char>(character);
+        if (byte >= 0x20 && byte != 0x7f) {
+            shown += character;
+            continue;
+        }
+        char escaped[8];
+        std::snprintf(escaped, sizeof escaped, "\\x%02x", byte);
+        shown += escaped;
+    }
+    return shown;
+}
+
+void Output::json(const nlohmann::json& document) const { std::printf("%s\n", dumped(document).c_str()); }
+
+void Output::line(const std::string& text) const { std::printf("%s\n", text.c_str()); }
+
+void Output::table(const std::vector<std::string>& header, const std::vector<std::vector<std::string>>& rows) const {
+    std::vector<std::size_t> widths;
+    for (std::size_t column = 0; column < header.size(); ++column) {
+        widths.push_back(header[column].size());
+        for (const auto& row : rows)
+            widths.back() = std::max(widths.back(), row[column].size());
+    }
+    const auto print = [&](const std::vector<std::string>& row) {
+        for (std::size_t column = 0; column + 1 < row.size(); ++column)
+            std::printf("%-*s  ", static_cast<int>(widths[column]), row[column].c_str());
+        std::printf("%s\n", row.back().c_str());
+    };
+    print(header);
+    for (const auto& row : rows)
+        print(row);
+}
+
+int Output::error(const zorvane::Error& error, const std::string& while_) const {
+    const int exitCode = exitCodeOf(error);
+    if (isJson()) {
+        nlohmann::json document = {{"error",
+                                    {{"kind", kindName(error.kind)},
+                                     {"message", error.message},
+                                     {"advice", adviceFor(error)},
+                                     {"while", while_}}}};
+        if (error.kind == zorvane::Error::Kind::daemon)
+            document["error"]["code"] = error.code;
+        std::fprintf(stderr, "%s\n", dumped(document).c_str());
+        return exitCode;
+    }
+    const std::string code =
+        error.kind == zorvane::Error::Kind::daemon ? " (code " + std::to_string(error.code) + ")" : "";
+    std::fprintf(stderr, "zorvanectl: %s: %s%s\n  What to do: %s.\n", printable(while_).c_str(),
+                 error.message.c_str(), code.c_str(), adviceFor(error));
+    return exitCode;
+}
+
+nlohmann::json toJson(const zorvane::Value& value) {
+    return std::visit(
+        [](const auto& content) -> nlohmann::json {
+            using Content = std::decay_t<decltype(content)>;
+            if constexpr (std::is_same_v<Content, zorvane::List>) {
+                nlohmann::json array = nlohmann::json::array();
+                for (const auto& element : content)
+                    array.push_back(toJson(element));
+                return array;
+            } else if constexpr (std::is_same_v<Content, zorvane::Map>) {
+                nlohmann::json object = nlohmann::json::object();
+                for (const auto& [key, element] : content)
+                    object[key] = toJson(element);
+                return object;
+            } else {
+                return content;
+            }
+        },
+        value.content);
+}
+
+} // namespace zorvanectl

@@ -1,0 +1,43 @@
+// SPDX-License-Identifier: Apache-2.0
+// How the tool speaks: for people in words and tables, with --json for programs; results on standard output, errors on standard
+// error.
+#pragma once
+
+#include "zorvane/Client.h"
+
+#include <nlohmann/json.hpp>
+#include <string>
+#include <vector>
+
+namespace zorvanectl {
+
+// Exit codes; they do not change.
+inline constexpr int exitDone = 0;
+inline constexpr int exitDaemonError = 1;
+inline constexpr int exitUsage = 2;
+inline constexpr int exitUnreachable = 3;
+
+enum class Format { people, json };
+
+class Output {
+public:
+    explicit Output(Format format) : format_(format) {}
+
+    [[nodiscard]] bool isJson() const { return format_ == Format::json; }
+    void json(const nlohmann::json& document) const;
+    /// One line to standard output.
+    void line(const std::string& text) const;
+    /// Columns as wide as their widest cell, the header first; nothing but the header when there are no rows.
+    void table(const std::vector<std::string>& header, const std::vector<std::vector<std::string>>& rows) const;
+    /// Says what failed, what that means and what to do. The exit code for it.
+    [[nodiscard]] int error(const zorvane::Error& error, const std::string& while_) const;
+
+private:
+    const Format format_;
+};
+
+[[nodiscard]] nlohmann::json toJson(const zorvane::Value& value);
+/// Control characters shown as \xNN, so that a name cannot steer the terminal.
+[[nodiscard]] std::string printable(const std::string& text);
+
+} // namespace zorvanectl
