@@ -5,7 +5,7 @@
 #include <cerrno>
 #include <csignal>
 #include <cstdio>
-#include <cstring>
+#include <ctime>
 #include <fcntl.h>
 #include <poll.h>
 #include <pthread.h>
@@ -14,6 +14,7 @@
 #include <sys/eventfd.h>
 #include <system_error>
 #include <unistd.h>
+#include <utility>
 
 namespace zor::platform {
 
@@ -37,6 +38,22 @@ bool startThreadWithoutSignals(std::thread& thread, const char* name, std::funct
     }
     pthread_sigmask(SIG_SETMASK, &before, nullptr);
     return started;
+}
+
+/// Whether a thread computes or waits for a processor. One that computes gets little time on a crowded system, but it
+/// is no use to add another.
+bool isRunnable(pid_t threadId) {
+    char path[64];
+    std::snprintf(path, sizeof path, "/proc/self/task/%d/stat", static_cast<int>(threadId));
+    const FileDescriptor file(::openat(AT_FDCWD, path, O_RDONLY | O_CLOEXEC));
+    char text[128];
+    const ssize_t size = file.valid() ? ::read(file.get(), text, sizeof text) : -1;
+    if (size <= 0)
+        return false;
+    // "TID (NAME) STATE ...": the name may hold anything, so its end is the last parenthesis.
+    const std::string_view line(text, static_cast<std::size_t>(size));
+    const std::size_t nameEnd = line.rfind(')');
+    return nameEnd != std::string_view::npos && nameEnd + 2 < line.size() && line[nameEnd + 2] == 'R';
 }
 
 } // namespace
@@ -349,12 +366,9 @@ void ListenerPool::tick() {
             return;
     }
     for (const auto& worker : workers_) {
-        std::uint64_t state = worker->state;
-        const bool sameTask = state == worker->stateSeen;
-        worker->stateSeen = state;
-        if ((state & phaseMask) != static_cast<std::uint64_t>(Phase::working) || !sameTask ||
-            isRunning(worker->threadId) || !workIsReady())
+        if (!isStuck(*worker) || !workIsReady())
             continue;
+        std::uint64_t state = worker->stateSeen;
         if (worker->state.compare_exchange_strong(state,
                                                   (state & ~phaseMask) | static_cast<std::uint64_t>(Phase::blocked)))
             --active_;
@@ -368,18 +382,17 @@ bool ListenerPool::workIsReady() const {
     return requeuedCount_ > 0 || ::poll(&epoll, 1, 0) > 0;
 }
 
-bool ListenerPool::isRunning(pid_t threadId) {
-    char path[64];
-    std::snprintf(path, sizeof path, "/proc/self/task/%d/stat", static_cast<int>(threadId));
-    const FileDescriptor file(::openat(AT_FDCWD, path, O_RDONLY | O_CLOEXEC));
-    char text[128];
-    const ssize_t size = file.valid() ? ::read(file.get(), text, sizeof text) : -1;
-    if (size <= 0)
-        return false;
-    // "TID (NAME) STATE ...": the name may hold anything, so its end is the last parenthesis.
-    const std::string_view line(text, static_cast<std::size_t>(size));
-    const std::size_t nameEnd = line.rfind(')');
-    return nameEnd != std::string_view::npos && nameEnd + 2 < line.size() && line[nameEnd + 2] == 'R';
+bool ListenerPool::isStuck(Worker& worker) const {
+    timespec cpu = {};
+    clockid_t clock = 0;
+    if (pthread_getcpuclockid(worker.thread.native_handle(), &clock) == 0)
+        ::clock_gettime(clock, &cpu);
+    const std::chrono::nanoseconds cpuTime = std::chrono::seconds(cpu.tv_sec) + std::chrono::nanoseconds(cpu.tv_nsec);
+    const std::chrono::nanoseconds cpuUsed = cpuTime - std::exchange(worker.cpuTimeSeen, cpuTime);
+    const std::uint64_t state = worker.state;
+    const bool sameTask = state == std::exchange(worker.stateSeen, state);
+    return sameTask && (state & phaseMask) == static_cast<std::uint64_t>(Phase::working) && cpuUsed < tick_ / 10 &&
+           !isRunnable(worker.threadId);
 }
 
 } // namespace zor::platform

@@ -97,8 +97,9 @@ private:
         std::atomic<pid_t> threadId{0};
         /// The number of tasks begun, times four, plus the phase: so "the same task still" is one comparison.
         std::atomic<std::uint64_t> state{0};
-        /// What the watcher saw at its last tick.
+        // What the watcher saw at its last tick.
         std::uint64_t stateSeen = 0;
+        std::chrono::nanoseconds cpuTimeSeen{0};
         unsigned blockingDepth = 0;
         bool requeuedFirst = false;
         ListenerScratch scratch;
@@ -127,7 +128,9 @@ private:
     void watch();
     void tick() ZOR_REQUIRES(mutex_);
     bool workIsReady() const;
-    static bool isRunning(pid_t threadId);
+    /// Whether the worker has been in one task since the last tick, has computed next to nothing there, and is not
+    /// about to.
+    bool isStuck(Worker& worker) const;
 
     const unsigned running_;
     const unsigned threadsMax_;
