@@ -1,0 +1,108 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "platform/linux/StatusSocket.h"
+
+#include "ipc/Frame.h"
+#include "plist/Binary.h"
+
+#include <cerrno>
+#include <ctime>
+#include <span>
+#include <sys/socket.h>
+#include <unistd.h>
+#include <utility>
+
+namespace zor::platform {
+
+namespace {
+
+/// Connections answered before the loop looks at other things.
+constexpr unsigned answersPerTurn = 16;
+/// A socket takes this much without being asked to (net.core.wmem_default counts overhead too).
+constexpr std::size_t frameBytesSmall = std::size_t{64} * 1024;
+constexpr std::size_t frameBytesMax = std::size_t{1} << 20;
+
+} // namespace
+
+StatusSocket::StatusSocket(PeerIdentity& identity, RunLoop& runLoop, Build build)
+    : identity_(identity), runLoop_(runLoop), build_(std::move(build)) {}
+
+StatusSocket::~StatusSocket() {
+    close();
+}
+
+int StatusSocket::open(const ListenerAddress& address) {
+    auto made = makeListenerSocket(address, SOCK_STREAM, 0666);
+    if (!made)
+        return made.error();
+    listening_ = std::move(*made);
+    made_ = address;
+    return serve();
+}
+
+int StatusSocket::adopt(FileDescriptor listening) {
+    if (const int error = adoptListenerSocket(listening.get(), SOCK_STREAM); error != 0)
+        return error;
+    listening_ = std::move(listening);
+    return serve();
+}
+
+int StatusSocket::serve() {
+    if (runLoop_.watch(listening_.get(), [this] { answerAll(); }))
+        return 0;
+    const int error = errno;
+    close();
+    return error != 0 ? error : ENOMEM;
+}
+
+void StatusSocket::close() {
+    if (!listening_.valid())
+        return;
+    runLoop_.unwatch(listening_.get());
+    listening_.reset();
+    if (made_.directory >= 0)
+        ::unlinkat(made_.directory, made_.name.c_str(), 0);
+    made_ = {};
+}
+
+void StatusSocket::answerAll() {
+    for (unsigned i = 0; i < answersPerTurn; ++i) {
+        const ListenerAcceptor::Accepted accepted = acceptor_.accept(listening_.get());
+        switch (accepted.outcome) {
+        case ListenerAcceptor::Outcome::accepted:
+            answer(accepted.socket.get());
+            break;
+        case ListenerAcceptor::Outcome::refused:
+            break;
+        case ListenerAcceptor::Outcome::exhausted: {
+            // The socket stays readable, and the loop comes back at once: not at full speed.
+            const timespec pause = {.tv_sec = 0, .tv_nsec = 1'000'000};
+            ::nanosleep(&pause, nullptr);
+            return;
+        }
+        case ListenerAcceptor::Outcome::none:
+            return;
+        }
+    }
+}
+
+void StatusSocket::answer(int socket) {
+    const std::unique_ptr<Peer> peer = identity_.peerOfSocket(socket);
+    if (!peer)
+        return;
+    frame_.resize(ipc::frameHeaderBytes);
+    if (!plist::appendBinary(build_(*peer), frame_) || frame_.size() > frameBytesMax)
+        return;
+    const ipc::FrameHeader header = {.payloadBytes = static_cast<std::uint32_t>(frame_.size() - ipc::frameHeaderBytes),
+                                     .flags = ipc::frameIsReply,
+                                     .id = 0};
+    ipc::encodeFrameHeader(header, std::span(frame_).first<ipc::frameHeaderBytes>());
+    if (frame_.size() > frameBytesSmall) {
+        // Privileged daemons may pass net.core.wmem_max; others get what it allows.
+        const int wanted = static_cast<int>(frame_.size());
+        if (::setsockopt(socket, SOL_SOCKET, SO_SNDBUFFORCE, &wanted, sizeof wanted) != 0)
+            ::setsockopt(socket, SOL_SOCKET, SO_SNDBUF, &wanted, sizeof wanted);
+    }
+    [[maybe_unused]] const ssize_t sent = ::send(socket, frame_.data(), frame_.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
+}
+
+} // namespace zor::platform
