@@ -1,0 +1,211 @@
+// SPDX-License-Identifier: Apache-2.0
+// Error values and their one line, the level gate, the limit on provoked lines, and the boundary where exceptions end.
+#include "daemon/base/ZORException.h"
+#include "platform/linux/FileCrashAnnotation.h"
+#include "platform/linux/LinuxDisk.h"
+#include "platform/linux/Names.h"
+#include "support/FileTree.h"
+#include "support/RecordingLog.h"
+
+#include <csignal>
+#include <fstream>
+#include <gtest/gtest.h>
+#include <iterator>
+#include <pthread.h>
+#include <stdexcept>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <thread>
+#include <unistd.h>
+
+namespace zor {
+namespace {
+
+using support::LogLine;
+
+// Goal: one line exactly when it is asked for, with the place and the cause. Method: a table over flag and cause.
+TEST(Error, IsLoggedOnceWhereItIsMade) {
+    const ZORError cause = posixError({"rename", 7}, ENOENT, "rename of %s failed", "/a");
+    struct Row {
+        const ZORError* underlying;
+        LogFlag flag;
+        std::vector<LogLine> lines;
+    };
+    const Row rows[] = {
+        {nullptr, LogFlag::no, {}},
+        {&cause, LogFlag::no, {}},
+        {nullptr, LogFlag::yes, {{3, "operation", "42: Failed to move 5"}}},
+        {&cause, LogFlag::yes, {{3, "operation", "42: Failed to move 5 (POSIX 2 \"rename of /a failed\")"}}},
+    };
+    for (const Row& row : rows) {
+        support::RecordingLog sink(logLevelNotice);
+        const Log log(sink);
+        const ZORError error = makeError(log, {"operation", 42}, ErrorCode::moveToLiveFailed, row.underlying, row.flag,
+                                         "Failed to move %d", 5);
+        EXPECT_EQ(sink.take(), row.lines);
+        EXPECT_TRUE(error.is(ErrorCode::moveToLiveFailed));
+        EXPECT_EQ(error.replyCode(), static_cast<ErrorCode>(8));
+        EXPECT_EQ(error.description(), "Failed to move 5");
+        EXPECT_STREQ(error.functionName(), "operation");
+        EXPECT_EQ(error.sourceFileLine(), 42);
+        ASSERT_EQ(error.underlying() != nullptr, row.underlying != nullptr);
+        if (row.underlying) {
+            EXPECT_TRUE(error.underlying()->isPosix(ENOENT));
+        }
+    }
+    const ZORError bare({"operation", 42}, ErrorDomain::zor, -3, std::nullopt);
+    EXPECT_FALSE(bare.description());
+    EXPECT_EQ(static_cast<std::uint64_t>(bare.replyCode()), 0xFFFF'FFFF'FFFF'FFFDU);
+    EXPECT_FALSE(cause.is(static_cast<ErrorCode>(2)));
+}
+
+// Goal: which levels are written. Method: every handle state against every level; the arguments of an unwritten line are
+// not evaluated.
+TEST(Log, LevelGate) {
+    struct Row {
+        int handleLevel; // 0: no handle
+        std::vector<int> written;
+    };
+    for (const Row& row : {Row{0, {3, 5}}, Row{3, {3}}, Row{5, {3, 5}}, Row{6, {3, 5}}, Row{7, {3, 5, 7}}}) {
+        support::RecordingLog sink(row.handleLevel);
+        const Log log(sink);
+        std::vector<int> evaluated;
+        const auto note = [&](int level) {
+            evaluated.push_back(level);
+            return level;
+        };
+        for (const int level : {3, 5, 7})
+            ZOR_LOG(log, level, "level %d", note(level));
+        std::vector<int> written;
+        for (const LogLine& line : sink.take())
+            written.push_back(line.level);
+        EXPECT_EQ(written, row.written) << row.handleLevel;
+        EXPECT_EQ(evaluated, row.written) << row.handleLevel;
+    }
+}
+
+// Goal: only level 3 of the thread that serves the client counts against its user. Method: a gate that refuses all, scopes
+// inside each other, another thread.
+TEST(Log, ProvokedLinesAskTheGate) {
+    support::RecordingLog sink(logLevelDebug);
+    Log log(sink);
+    std::vector<std::uint32_t> asked;
+    log.limitRefusals([&](std::uint32_t userId) {
+        asked.push_back(userId);
+        return false;
+    });
+    log.write(3, "f", "before");
+    {
+        const Log::ClientScope outer(501);
+        log.write(3, "f", "refused");
+        log.write(5, "f", "notable");
+        {
+            const Log::ClientScope inner(502);
+            log.write(3, "f", "refused too");
+        }
+        std::thread([&] { log.write(3, "f", "elsewhere"); }).join();
+        log.write(3, "f", "refused again");
+    }
+    log.write(3, "f", "after");
+    EXPECT_EQ(asked, (std::vector<std::uint32_t>{501, 502, 501}));
+    EXPECT_EQ(sink.take(), (std::vector<LogLine>{
+                               {3, "f", "before"}, {5, "f", "notable"}, {3, "f", "elsewhere"}, {3, "f", "after"}}));
+}
+
+TEST(Log, ShowsObjectsCutAndAbsentOnes) {
+    const std::string exact(shownBytesMax, 'x');
+    const std::string longer = exact + "y";
+    const std::optional<std::string> absent;
+    EXPECT_EQ(std::string(ZOR_SHOWN(longer)), exact);
+    EXPECT_EQ(std::string(ZOR_SHOWN(exact)), exact);
+    EXPECT_STREQ(ZOR_SHOWN(absent), "(null)");
+    EXPECT_STREQ(ZOR_SHOWN(static_cast<const std::string*>(nullptr)), "(null)");
+    EXPECT_EQ(formatted("%s!", longer.c_str()), longer + "!"); // longer than the small buffer
+}
+
+class Build final : public platform::InternalBuildQuery {
+public:
+    explicit Build(bool internal) : internal_(internal) {}
+    [[nodiscard]] bool isInternalBuild() const override { return internal_; }
+
+private:
+    const bool internal_;
+};
+
+class NoAnnotation final : public platform::CrashAnnotation {
+public:
+    void record(std::string_view) override { ADD_FAILURE() << "a crash was recorded"; }
+};
+
+// Goal: an exception becomes error 40 under the operation's name, anything that is none passes through. Method: the three
+// kinds of throw.
+TEST(ExceptionBoundary, TurnsExceptionsIntoError40) {
+    support::RecordingLog sink(logLevelNotice);
+    const Log log(sink);
+    const Build build(false);
+    NoAnnotation annotation;
+    ExceptionBoundary boundary(log, build, annotation);
+
+    const auto ok = boundary.run({"lookup", 1}, []() -> Result<int> { return 7; });
+    EXPECT_EQ(*ok, 7);
+    EXPECT_TRUE(sink.take().empty());
+
+    const auto own = boundary.run({"lookup", 2}, []() -> Result<int> { throw ZORException("Range", "5 beyond 4"); });
+    ASSERT_FALSE(own);
+    EXPECT_TRUE(own.error().is(ErrorCode::exceptionCaught));
+    auto lines = sink.take(3, "lookup");
+    ASSERT_EQ(lines.size(), 1U);
+    EXPECT_TRUE(lines[0].starts_with("2: Got exception: Range: 5 beyond 4 : ")) << lines[0];
+    EXPECT_NE(lines[0].find(", "), std::string::npos) << "no call stack: " << lines[0];
+
+    const auto foreign = boundary.run({"lookup", 3}, []() -> Result<int> { return std::vector<int>().at(1); });
+    ASSERT_FALSE(foreign);
+    EXPECT_TRUE(foreign.error().is(ErrorCode::exceptionCaught));
+
+    struct NoException {};
+    EXPECT_THROW((void)boundary.run({"lookup", 4}, []() -> Result<int> { throw NoException(); }), NoException);
+}
+
+// Goal: on an internal build the process dies with the first report in its file. Method: a child whose threads all fail at
+// once; how it ended and the one file it left.
+TEST(ExceptionBoundary, AnInternalBuildAbortsWithTheFirstReport) {
+    const support::TemporaryDirectory directory;
+    std::string logs = directory.path();
+    for (const char* level : {"/private", "/var", "/root", "/Library", "/Logs", "/Zorvane"})
+        ASSERT_EQ(::mkdir((logs += level).c_str(), 0755), 0);
+    const pid_t child = ::fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+        const struct rlimit noCore {};
+        ::setrlimit(RLIMIT_CORE, &noCore);
+        auto root = platform::SystemRoot::open(directory.path());
+        platform::LinuxDisk disk(platform::Syncs::off);
+        platform::FileCrashAnnotation annotation(*root, disk);
+        support::RecordingLog sink(logLevelNotice);
+        const Log log(sink);
+        const Build build(true);
+        ExceptionBoundary boundary(log, build, annotation);
+        std::vector<std::thread> threads;
+        for (int i = 0; i < 4; ++i)
+            threads.emplace_back([&] {
+                ::pthread_setname_np(::pthread_self(), "worker");
+                (void)boundary.run({"lookup", 1}, []() -> Result<int> { throw ZORException("Range", "5 beyond 4"); });
+            });
+        for (std::thread& thread : threads)
+            thread.join();
+        ::_exit(0);
+    }
+    int status = 0;
+    ASSERT_EQ(::waitpid(child, &status, 0), child);
+    EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGABRT) << status;
+    std::ifstream file(directory.path() + "/" + platform::names::logDirectory + "/" + platform::names::crashFile);
+    const std::string report{std::istreambuf_iterator<char>(file), {}};
+    EXPECT_TRUE(report.starts_with("** INTERNAL ERROR: Uncaught Exception **\n"
+                                   "Exception: <worker> Range: 5 beyond 4\nStack:\n"))
+        << report;
+    EXPECT_EQ(report.find("INTERNAL ERROR", 5), std::string::npos) << "a second report was written";
+}
+
+} // namespace
+} // namespace zor

@@ -1,0 +1,118 @@
+// SPDX-License-Identifier: Apache-2.0
+// Whose containers a request may act on, as tables over every class; the lookup of the mobile user by many threads at once.
+#include "daemon/base/UserIdentity.h"
+#include "support/RecordingLog.h"
+
+#include <atomic>
+#include <gtest/gtest.h>
+#include <optional>
+#include <thread>
+
+namespace zor {
+namespace {
+
+class CountingPasswords final : public platform::PasswordDatabase {
+public:
+    explicit CountingPasswords(std::optional<std::uint32_t> mobile) : mobile_(mobile) {}
+    [[nodiscard]] std::optional<platform::PasswordEntry> entryForUserId(std::uint32_t) const override {
+        return std::nullopt;
+    }
+    [[nodiscard]] std::optional<platform::PasswordEntry> entryForName(std::string_view name) const override {
+        ++lookups;
+        std::this_thread::sleep_for(std::chrono::milliseconds(5));
+        if (name != "mobile" || !mobile_)
+            return std::nullopt;
+        return platform::PasswordEntry{.name = "mobile", .uid = *mobile_, .homeDirectory = "/private/var/mobile"};
+    }
+    mutable std::atomic<int> lookups{0};
+
+private:
+    const std::optional<std::uint32_t> mobile_;
+};
+
+// Goal: each class accepts exactly its owners. Method: the set of accepted ids among the ids next to every bound.
+TEST(UserIdentity, EachClassHasItsOwners) {
+    const std::vector<std::uint32_t> bounds = {0, 1, 32, 33, 34, 498, 499, 500, 501, 510, 511, 4294967295U};
+    for (std::uint64_t number = 0; number <= 15; ++number) {
+        std::vector<std::uint32_t> expected;
+        if (number == 1 || number == 3 || number == 5 || number == 8)
+            expected = {33};
+        else if (number == 12 || number == 13)
+            expected = {499};
+        else if (number >= 2 && number <= 11)
+            expected = {501, 510};
+        std::vector<std::uint32_t> accepted;
+        for (const std::uint32_t id : bounds)
+            if (userIdIsValidForClass(static_cast<ContainerClass>(number), id))
+                accepted.push_back(id);
+        EXPECT_EQ(accepted, expected) << "class " << number;
+    }
+    EXPECT_FALSE(userIdIsValidForClass(static_cast<ContainerClass>((std::uint64_t{1} << 32) + 2), 501));
+}
+
+// Goal: the first matching rule decides. Method: a table with the resolved user, or none for error 38 and its one line.
+TEST(UserIdentity, RequestsResolveByClassAndClient) {
+    struct Row {
+        std::uint32_t requested;
+        std::uint64_t containerClass;
+        std::uint32_t client;
+        std::optional<std::uint32_t> resolved;
+    };
+    const std::vector<Row> rows = {
+        // Bundle and system classes: the owner, whoever asks.
+        {33, 1, 0, 33}, {33, 8, 501, 33}, {1, 1, 0, {}}, {1, 1, 501, {}}, {501, 5, 501, {}}, {501, 3, 0, {}},
+        {499, 12, 0, 499}, {499, 13, 501, 499}, {1, 12, 0, {}}, {501, 13, 501, {}}, {505, 12, 0, {}},
+        // System clients: 1 is the mobile user whatever the class, others by the table of owners.
+        {1, 2, 0, 507}, {1, 2, 500, 507}, {1, 0, 0, 507}, {1, 14, 0, 507}, {505, 2, 0, 505}, {510, 11, 499, 510},
+        {511, 2, 0, {}}, {500, 2, 0, {}}, {0, 2, 0, {}}, {501, 14, 0, {}},
+        // Mobile clients act as themselves.
+        {1, 2, 501, 501}, {501, 2, 501, 501}, {502, 2, 501, {}}, {0, 2, 501, {}}, {1, 0, 501, 501}, {1, 99, 777, 777},
+        {777, 2, 777, 777}, {507, 7, 501, {}},
+    };
+    for (const Row& row : rows) {
+        support::RecordingLog sink(logLevelNotice);
+        const Log log(sink);
+        const CountingPasswords passwords(507);
+        UserIdentity users(log, passwords);
+        const auto resolved =
+            users.validateUserId(row.requested, static_cast<ContainerClass>(row.containerClass), row.client);
+        const std::string text = formatted("Invalid userId %u for class %llu from client %u", row.requested,
+                                           static_cast<unsigned long long>(row.containerClass), row.client);
+        const auto lines = sink.take();
+        if (row.resolved) {
+            ASSERT_TRUE(resolved) << text;
+            EXPECT_EQ(*resolved, *row.resolved) << text;
+            EXPECT_FALSE(support::hasLine(lines, 3, "validateUserId", text));
+        } else {
+            ASSERT_FALSE(resolved) << text;
+            EXPECT_TRUE(resolved.error().is(ErrorCode::valueNotAllowed)) << text;
+            EXPECT_EQ(lines, (std::vector<support::LogLine>{{3, "validateUserId", text}}));
+        }
+    }
+}
+
+// Goal: one lookup for ever, and all first callers get its answer. Method: many threads ask at once, with and without the
+// account.
+TEST(UserIdentity, TheMobileUserIsLookedUpOnce) {
+    for (const auto& account : {std::optional<std::uint32_t>(501), std::optional<std::uint32_t>()}) {
+        support::RecordingLog sink(logLevelNotice);
+        const Log log(sink);
+        const CountingPasswords passwords(account);
+        UserIdentity users(log, passwords);
+        std::atomic<int> agreeing{0};
+        std::vector<std::thread> threads;
+        for (int i = 0; i < 8; ++i)
+            threads.emplace_back([&] { agreeing += users.getCurrentMobileUserId() == account.value_or(0) ? 1 : 0; });
+        for (std::thread& thread : threads)
+            thread.join();
+        EXPECT_EQ(agreeing, 8);
+        EXPECT_EQ(passwords.lookups, 1);
+        const char* message =
+            account ? "Current mobile user ID is 501" : "Failed to get mobile uid. This is bad";
+        EXPECT_EQ(sink.take(),
+                  (std::vector<support::LogLine>{{3, "__getCurrentMobileUserId_block_invoke", message}}));
+    }
+}
+
+} // namespace
+} // namespace zor

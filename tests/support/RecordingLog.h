@@ -1,0 +1,113 @@
+// SPDX-License-Identifier: Apache-2.0
+// A log that keeps its lines, so that a test can ask for the exact level, function and words. Any thread.
+#pragma once
+
+#include "platform/Mutex.h"
+#include "platform/PlatformLog.h"
+
+#include <algorithm>
+#include <ostream>
+#include <string>
+#include <utility>
+#include <vector>
+
+namespace zor::support {
+
+struct LogLine {
+    int level = 0;
+    std::string function;
+    std::string message;
+    bool operator==(const LogLine&) const = default;
+};
+
+inline std::ostream& operator<<(std::ostream& out, const LogLine& line) {
+    return out << "<" << line.level << "> " << line.function << ": " << line.message;
+}
+
+class RecordingLog final : public platform::PlatformLog {
+public:
+    /// `level` of a handle that is open from the start; 0 for none yet.
+    explicit RecordingLog(int level = 0) : level_(level) {}
+
+    bool open(std::string_view name, int level) override {
+        const platform::MutexLock held(mutex_);
+        openedAs_ = name;
+        level_ = refusesToOpen_ ? 0 : level;
+        return level_ != 0;
+    }
+    [[nodiscard]] bool isOpen() const override {
+        const platform::MutexLock held(mutex_);
+        return level_ != 0;
+    }
+    [[nodiscard]] int level() const override {
+        const platform::MutexLock held(mutex_);
+        return level_;
+    }
+    void enableDiskLogging(const std::string& path, unsigned fileCount, std::size_t fileBytesMax) override {
+        const platform::MutexLock held(mutex_);
+        disk_ = path + " " + std::to_string(fileCount) + " " + std::to_string(fileBytesMax);
+    }
+    void write(int level, std::string_view function, std::string_view message) override {
+        const platform::MutexLock held(mutex_);
+        lines_.push_back({level, std::string(function), std::string(message)});
+    }
+    void writeToSystemLog(int priority, std::string_view message) override {
+        const platform::MutexLock held(mutex_);
+        lines_.push_back({priority, "syslog", std::string(message)});
+    }
+
+    void setLevel(int level) {
+        const platform::MutexLock held(mutex_);
+        level_ = level;
+    }
+    void refuseToOpen() {
+        const platform::MutexLock held(mutex_);
+        refusesToOpen_ = true;
+    }
+    /// The lines since the last call.
+    std::vector<LogLine> take() {
+        const platform::MutexLock held(mutex_);
+        return std::exchange(lines_, {});
+    }
+    /// The messages of the lines since the last call that `function` wrote at `level`.
+    std::vector<std::string> take(int level, std::string_view function) {
+        std::vector<std::string> messages;
+        for (LogLine& line : take())
+            if (line.level == level && line.function == function)
+                messages.push_back(std::move(line.message));
+        return messages;
+    }
+    /// "NAME" and "PATH COUNT BYTES" as they were asked for.
+    [[nodiscard]] std::string openedAs() const {
+        const platform::MutexLock held(mutex_);
+        return openedAs_;
+    }
+    [[nodiscard]] std::string diskLogging() const {
+        const platform::MutexLock held(mutex_);
+        return disk_;
+    }
+
+private:
+    mutable platform::Mutex mutex_;
+    int level_ ZOR_GUARDED_BY(mutex_);
+    bool refusesToOpen_ ZOR_GUARDED_BY(mutex_) = false;
+    std::string openedAs_ ZOR_GUARDED_BY(mutex_);
+    std::string disk_ ZOR_GUARDED_BY(mutex_);
+    std::vector<LogLine> lines_ ZOR_GUARDED_BY(mutex_);
+};
+
+/// An error's own line begins with the place where it was made; the rest of it.
+inline std::string withoutSourceLine(const std::string& message) {
+    const std::size_t digits = std::min(message.find_first_not_of("0123456789"), message.size());
+    return digits > 0 && message.compare(digits, 2, ": ") == 0 ? message.substr(digits + 2) : message;
+}
+
+inline bool hasLine(const std::vector<LogLine>& lines, int level, std::string_view function,
+                    std::string_view message) {
+    return std::ranges::any_of(lines, [&](const LogLine& line) {
+        return line.level == level && line.function == function &&
+               (line.message == message || withoutSourceLine(line.message) == message);
+    });
+}
+
+} // namespace zor::support

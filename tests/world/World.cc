@@ -1,0 +1,186 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "world/World.h"
+
+#include "plist/Binary.h"
+
+#include <algorithm>
+#include <cstdio>
+#include <dirent.h>
+#include <fstream>
+#include <future>
+#include <iterator>
+#include <stdexcept>
+#include <unistd.h>
+
+namespace zor::test {
+
+namespace {
+
+constexpr const char* passwd = "root:x:0:0::/private/var/root:/bin/sh\n"
+                               "mobile:x:501:501::/private/var/mobile:/bin/sh\n"
+                               "second:x:502:502::/private/var/second:/bin/sh\n"
+                               "homeless:x:503:503::/private/var/nowhere:/bin/sh\n";
+
+bool canGiveAway() { return ::geteuid() == 0; }
+
+platform::Platform withRoles(const platform::Platform& real, World& world) {
+    return {.root = real.root,
+            .disk = world.disk(),
+            .log = world.log,
+            .internalBuild = world.internalBuild,
+            .systemVersion = real.systemVersion,
+            .passwords = real.passwords,
+            .lockState = world.lockState,
+            .protection = real.protection,
+            .sandbox = world.sandbox,
+            .crash = real.crash,
+            .bootMarker = world.bootMarker,
+            .transactions = real.transactions,
+            .deathRowQueue = real.deathRowQueue,
+            .lockStateQueue = real.lockStateQueue,
+            .runLoop = real.runLoop,
+            .peers = real.peers,
+            .listener = real.listener,
+            .upcallPort = real.upcallPort};
+}
+
+void require(bool done, const std::string& what) {
+    if (!done)
+        throw std::runtime_error("the test's world: " + what + ": " + std::to_string(errno));
+}
+
+} // namespace
+
+std::string itemAt(const std::string& path) {
+    struct stat status {};
+    if (::lstat(path.c_str(), &status) != 0)
+        return "missing";
+    const char* kind = S_ISDIR(status.st_mode) ? "directory" : S_ISREG(status.st_mode) ? "file" : "other";
+    char text[96];
+    std::snprintf(text, sizeof text, "%s %04o %u:%u", kind, static_cast<unsigned>(status.st_mode & 07777),
+                  status.st_uid, status.st_gid);
+    return text;
+}
+
+std::string directoryOf(std::uint32_t owner, mode_t mode) {
+    char text[96];
+    std::snprintf(text, sizeof text, "directory %04o %u:%u", static_cast<unsigned>(mode),
+                  canGiveAway() ? owner : ::geteuid(), canGiveAway() ? owner : ::getegid());
+    return text;
+}
+
+World::World(Options options)
+    : log(options.logLevel), options_(std::move(options)), directory_(options_.parent), realDisk_(options_.syncs) {
+    ::chmod(directory_.path().c_str(), 0755);
+    write("etc/passwd", passwd);
+    makeDirectories("tmp", 0, 01777);
+    makeDirectories("private/var/root", 0, 0700);
+    makeDirectories("private/var/mobile", mobile);
+    makeDirectories("private/var/second", second);
+    makeDirectories("private/var/brevad", bundleOwnerUserId);
+    start();
+}
+
+World::~World() {
+    platform_->finish();
+}
+
+void World::start() {
+    auto opened = platform::LinuxPlatform::open({.rootDirectory = directory_.path(), .syncs = options_.syncs});
+    require(opened.has_value(), "no platform");
+    platform_ = std::move(*opened);
+    sandbox.inner = &platform_->roles().sandbox;
+    composition_ = std::make_unique<Composition>(withRoles(platform_->roles(), *this), options_.probe);
+}
+
+void World::restart() {
+    platform_->finish();
+    composition_.reset();
+    platform_.reset();
+    start();
+}
+
+std::shared_ptr<ZORClientConnection> World::client(ZORClientConnection::Client client) {
+    return std::make_shared<ZORClientConnection>(composition_->store(), std::move(client));
+}
+
+void World::drainDeathRow() {
+    std::promise<void> reached;
+    platform_->roles().deathRowQueue.async([&] { reached.set_value(); });
+    reached.get_future().wait();
+}
+
+std::string World::path(std::string_view relative) const {
+    return relative.empty() ? directory_.path() : directory_.path() + "/" + std::string(relative);
+}
+
+void World::makeDirectories(std::string_view relative, std::uint32_t owner, mode_t mode) const {
+    for (std::size_t end = relative.find('/');; end = relative.find('/', end + 1)) {
+        const std::string level = path(relative.substr(0, end));
+        const bool last = end == std::string_view::npos;
+        if (::mkdir(level.c_str(), 0755) == 0 || last)
+            require(::chmod(level.c_str(), last ? mode : 0755) == 0 &&
+                        (!canGiveAway() || ::chown(level.c_str(), owner, owner) == 0),
+                    level);
+        if (last)
+            return;
+    }
+}
+
+void World::write(std::string_view relative, std::string_view bytes, mode_t mode) const {
+    const std::size_t slash = relative.rfind('/');
+    if (slash != std::string_view::npos && !exists(relative.substr(0, slash)))
+        makeDirectories(relative.substr(0, slash));
+    std::ofstream file(path(relative), std::ios::trunc | std::ios::binary);
+    file.write(bytes.data(), static_cast<std::streamsize>(bytes.size()));
+    file.close();
+    require(file.good() && ::chmod(path(relative).c_str(), mode) == 0, std::string(relative));
+}
+
+std::string World::read(std::string_view relative) const {
+    std::ifstream file(path(relative), std::ios::binary);
+    return {std::istreambuf_iterator<char>(file), {}};
+}
+
+std::vector<std::string> World::names(std::string_view relative) const {
+    std::vector<std::string> found;
+    if (DIR* directory = ::opendir(path(relative).c_str())) {
+        while (const dirent* entry = ::readdir(directory))
+            if (std::string_view(entry->d_name) != "." && std::string_view(entry->d_name) != "..")
+                found.emplace_back(entry->d_name);
+        ::closedir(directory);
+    }
+    std::ranges::sort(found);
+    return found;
+}
+
+std::vector<std::string> World::deathRow() const {
+    const std::string row = std::string(cachesPath) + "/Dead";
+    std::vector<std::string> found;
+    for (const std::string& unique : names(row))
+        for (std::string& name : names(row + "/" + unique))
+            found.push_back(std::move(name));
+    std::ranges::sort(found);
+    return found;
+}
+
+void World::putContainer(std::string_view relative, const plist::Dictionary& metadata) const {
+    makeDirectories(relative);
+    write(std::string(relative) + "/" + names::metadataFile, binary(metadata));
+}
+
+plist::Dictionary metadataOf(std::uint64_t containerClass, std::uint32_t userId, const std::string& identifier,
+                             const std::string& uuid) {
+    return {{"ZORMetadataContentClass", containerClass},
+            {"ZORMetadataPersona", userId},
+            {"ZORMetadataIdentifier", identifier},
+            {"ZORMetadataUUID", uuid}};
+}
+
+std::string binary(const plist::Value& value) {
+    const auto bytes = plist::writeBinary(value);
+    require(bytes.has_value(), "value that cannot be written");
+    return {bytes->begin(), bytes->end()};
+}
+
+} // namespace zor::test

@@ -1,0 +1,152 @@
+// SPDX-License-Identifier: Apache-2.0
+// A device of a test's own: a temporary root with the accounts and homes that the daemon expects, the Linux platform over
+// it with some roles in the test's hand, and one daemon's services, which may be ended and begun anew on the same disk.
+//
+// Everything a client is shown or a log line says is the real thing. In the test's hand: the disk may fail (`disk`), the log
+// keeps its lines, the build may be internal, the device may be locked, the boot is a flag. One thread makes, restarts and
+// ends a world.
+#pragma once
+
+#include "daemon/Composition.h"
+#include "platform/linux/LinuxDisk.h"
+#include "platform/linux/LinuxPlatform.h"
+#include "store/Names.h"
+#include "support/FaultDisk.h"
+#include "support/FileTree.h"
+#include "support/RecordingLog.h"
+
+#include <atomic>
+#include <memory>
+#include <string>
+#include <string_view>
+#include <sys/stat.h>
+#include <vector>
+
+namespace zor::test {
+
+inline constexpr std::uint32_t mobile = 501;
+inline constexpr std::uint32_t second = 502;
+
+class SettableBuild final : public platform::InternalBuildQuery {
+public:
+    [[nodiscard]] bool isInternalBuild() const override { return internal; }
+    std::atomic<bool> internal{false};
+};
+
+class FlagBootMarker final : public platform::BootMarker {
+public:
+    [[nodiscard]] State look() const override { return state; }
+    int make() override {
+        if (makeError == 0)
+            state = {.present = true, .foreign = false};
+        return makeError;
+    }
+    void forget() override { state = {}; }
+    [[nodiscard]] std::string name() const override { return "marker"; }
+    State state;
+    int makeError = 0;
+};
+
+class SettableLockState final : public platform::DeviceLockState {
+public:
+    [[nodiscard]] int currentState() const override { return state; }
+    int registerForChanges(platform::RunLoop&, std::function<void()> changed) override {
+        notify = std::move(changed);
+        return registrationStatus;
+    }
+    [[nodiscard]] const char* registrationCallName() const override { return "register"; }
+    [[nodiscard]] const char* notificationName() const override { return "lockstate"; }
+    std::atomic<int> state{0};
+    int registrationStatus = 0;
+    std::function<void()> notify;
+};
+
+/// Passes on what it is told until it is to fail.
+class FailingSandbox final : public platform::SandboxUserState {
+public:
+    int setMapping(std::uint32_t userId, platform::SandboxItemType type, std::string_view identifier,
+                   const std::optional<std::string>& path) override {
+        const int failure = path ? setError : removeError;
+        return failure != 0 ? failure : inner->setMapping(userId, type, identifier, path);
+    }
+    unsigned removeDanglingMappings() override { return inner->removeDanglingMappings(); }
+    platform::SandboxUserState* inner = nullptr;
+    int setError = 0;
+    int removeError = 0;
+};
+
+/// What lies at a path: kind, permission bits and owner in one text, "missing" when nothing does.
+std::string itemAt(const std::string& path);
+/// The same text for what should lie there. Owners are judged only where the process can give files away.
+std::string directoryOf(std::uint32_t owner, mode_t mode = 0755);
+
+class World {
+public:
+    struct Options {
+        std::string parent = "/dev/shm";
+        platform::Syncs syncs = platform::Syncs::off;
+        int logLevel = logLevelNotice;
+        fs::Durability::Probe probe = fs::orderingOfFileSystem;
+    };
+    World() : World(Options()) {}
+    explicit World(Options options);
+    ~World();
+    World(const World&) = delete;
+    World& operator=(const World&) = delete;
+
+    /// Ends the daemon's services and makes new ones, as a launch after a stop does. The disk stays.
+    void restart();
+    [[nodiscard]] Composition& services() { return *composition_; }
+    [[nodiscard]] ZORClientConnection& daemonsClient() { return *composition_->sharedClientConnection(); }
+    /// A client of one message.
+    [[nodiscard]] std::shared_ptr<ZORClientConnection> client(ZORClientConnection::Client client);
+    [[nodiscard]] platform::LinuxPlatform& linux() { return *platform_; }
+    /// Waits until everything queued for death row has run.
+    void drainDeathRow();
+
+    // The disk below the root; paths are relative to it.
+    [[nodiscard]] std::string path(std::string_view relative = "") const;
+    [[nodiscard]] FileURL url(std::string_view relative) const { return FileURL::directory(path(relative)); }
+    void makeDirectories(std::string_view relative, std::uint32_t owner = 0, mode_t mode = 0755) const;
+    void write(std::string_view relative, std::string_view bytes, mode_t mode = 0644) const;
+    [[nodiscard]] std::string read(std::string_view relative) const;
+    [[nodiscard]] std::string item(std::string_view relative) const { return itemAt(path(relative)); }
+    [[nodiscard]] bool exists(std::string_view relative) const { return item(relative) != "missing"; }
+    /// Names in a directory, hidden ones too, sorted.
+    [[nodiscard]] std::vector<std::string> names(std::string_view relative) const;
+    /// What is under death row's unique directories, sorted.
+    [[nodiscard]] std::vector<std::string> deathRow() const;
+
+    /// A container as an earlier launch left it: `relative` is its directory, made with its parents.
+    void putContainer(std::string_view relative, const plist::Dictionary& metadata) const;
+
+    support::RecordingLog log;
+    SettableBuild internalBuild;
+    FlagBootMarker bootMarker;
+    SettableLockState lockState;
+    FailingSandbox sandbox;
+    support::FaultDisk& disk() { return faults_; }
+
+private:
+    void start();
+
+    const Options options_;
+    support::TemporaryDirectory directory_;
+    platform::LinuxDisk realDisk_;
+    support::FaultDisk faults_{realDisk_};
+    std::unique_ptr<platform::LinuxPlatform> platform_;
+    std::unique_ptr<Composition> composition_;
+};
+
+/// The content of a metadata file.
+plist::Dictionary metadataOf(std::uint64_t containerClass, std::uint32_t userId, const std::string& identifier,
+                             const std::string& uuid = "00000000-0000-4000-8000-000000000001");
+std::string binary(const plist::Value& value);
+
+inline constexpr const char* cachesPath = "private/var/root/Library/Caches/com.veltra.zorvaned";
+inline constexpr const char* libraryPath = "private/var/root/Library/Zorvane";
+inline constexpr const char* sharedPath = "private/var/containers";
+inline constexpr const char* mobileContainers = "private/var/mobile/Containers";
+inline constexpr const char* mobileCaches = "private/var/mobile/Containers/Library/Caches/com.veltra.zorvaned";
+
+} // namespace zor::test
