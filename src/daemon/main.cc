@@ -3,10 +3,14 @@
 #include "daemon/Composition.h"
 #include "daemon/Daemon.h"
 #include "daemon/Options.h"
+#include "daemon/Status.h"
 #include "platform/linux/LinuxPlatform.h"
+#include "platform/linux/Names.h"
 #include "platform/linux/NotifySocket.h"
 #include "platform/linux/SignalDescriptor.h"
+#include "platform/linux/StatusSocket.h"
 
+#include <atomic>
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
@@ -63,6 +67,34 @@ private:
     std::atomic<bool> wanted_{false};
 };
 
+/// What only the platform's own objects count.
+void addPlatformCounters(platform::LinuxPlatform& platform, plist::Dictionary& counters) {
+    const platform::ListenerCounters listener = platform.listener().counters();
+    counters.set("Connections", listener.connections);
+    counters.set("ConnectionsAccepted", listener.connectionsAccepted);
+    counters.set("ConnectionsRefused", listener.connectionsRefused);
+    counters.set("ConnectionsDropped", listener.connectionsDropped);
+    counters.set("Messages", listener.messages);
+    counters.set("BrokenFrames", listener.brokenFrames);
+    counters.set("ForeignSenders", listener.foreignSenders);
+    counters.set("BufferedInputBytes", listener.inputBytes);
+    counters.set("BufferedOutputBytes", listener.outputBytes);
+    counters.set("ListenerThreads", listener.threads);
+    counters.set("ListenerThreadsMost", listener.threadsMost);
+    counters.set("LogLinesLost", platform.log().linesLost());
+}
+
+/// The status is a help, not a service: without it the daemon goes on, and says so.
+void openStatus(platform::LinuxPlatform& platform, platform::StatusSocket& socket, const Log& log) {
+    using namespace zor::platform::names;
+    auto passed = platform.passedSockets().take(passedStatusSocket);
+    const platform::ListenerAddress address{.directory = platform.root().runtimeDirectory(),
+                                            .directoryPath = platform.root().path(runtimeDirectory),
+                                            .name = statusSocket};
+    if (const int failure = passed.valid() ? socket.adopt(std::move(passed)) : socket.open(address))
+        log.write(logLevelError, "main", "No status socket: %s", errorText(failure));
+}
+
 } // namespace
 
 int main(int argumentCount, char** arguments) {
@@ -90,9 +122,16 @@ int main(int argumentCount, char** arguments) {
     const StopOnSignal stop(**platform);
     Composition composition((*platform)->roles());
     const auto notify = platform::NotifySocket::ofEnvironment();
-    Daemon daemon(composition, {.logLevel = options->logLevel, .ready = [&] { (void)notify.send("READY=1"); }});
-    const int status = daemon.run();
+    Status status(composition, [&](plist::Dictionary& counters) { addPlatformCounters(**platform, counters); });
+    platform::StatusSocket statusSocket((*platform)->peers(), (*platform)->runLoop(),
+                                        [&](platform::Peer& peer) { return status.forPeer(peer); });
+    Daemon daemon(composition, {.logLevel = options->logLevel, .ready = [&] {
+                                    openStatus(**platform, statusSocket, composition.log());
+                                    (void)notify.send("READY=1");
+                                }});
+    const int exitStatus = daemon.run();
     (void)notify.send("STOPPING=1");
+    statusSocket.close();
     (*platform)->finish();
-    return status;
+    return exitStatus;
 }
