@@ -58,7 +58,7 @@ Result<void> ZORFileManager::makeNewDirectory(const FileURL& url, Intermediates 
         name = uniqueName(finalName + ".");
         made = disk_.makeDirectory(parent->get(), name.c_str(), attributes.mode);
     }
-    const std::string temporaryPath = parentUrl.appendingDirectory(name).path();
+    const std::string temporaryPath = parent ? parentUrl.appendingDirectory(name).path() : url.path();
     if (made == -EEXIST)
         return posixError(ZOR_HERE, EEXIST, "Failed to create temp dir at path %s : %s", temporaryPath.c_str(),
                           errorText(EEXIST));
