@@ -1,0 +1,274 @@
+// SPDX-License-Identifier: Apache-2.0
+// The file manager's work on trees: listing, moving (across file systems too), removing, re-owning, reporting orphans.
+#include "fs/FileManagerWorld.h"
+#include "fs/MetadataFileName.h"
+
+#include <linux/fs.h>
+#include <sched.h>
+#include <sys/ioctl.h>
+#include <sys/mount.h>
+#include <sys/wait.h>
+
+namespace zor::fs::test {
+namespace {
+
+using support::DiskCall;
+using support::LogLine;
+
+TEST_F(FileManager, ListsWhatIsNotHidden) {
+    makeDirectory("d");
+    makeDirectory("d/sub");
+    makeFile("d/file");
+    makeLink("d/link", "sub");
+    makeLink("d/dangling", "nowhere");
+    ASSERT_EQ(::mkfifo(path("d/fifo").c_str(), 0644), 0);
+    makeFile("d/.hidden");
+    makeFile(std::string("d/") + zor::names::metadataFile);
+    makeFile("d/..odd");
+    auto listed = manager().urlsForItemsInDirectoryAtURL(url("d"));
+    ASSERT_TRUE(listed);
+    std::vector<std::string> shown;
+    for (const FileURL& item : *listed)
+        shown.push_back(item.path().substr(path("d/").size()) + (item.isDirectory() ? "/" : ""));
+    std::ranges::sort(shown);
+    EXPECT_EQ(shown, (std::vector<std::string>{"dangling", "fifo", "file", "link", "sub/"}));
+
+    const auto missing = manager().urlsForItemsInDirectoryAtURL(url("nowhere"));
+    ASSERT_FALSE(missing);
+    EXPECT_TRUE(missing.error().isPosix(ENOENT));
+    EXPECT_EQ(missing.error().description(),
+              "_IterateDirectory for " + path("nowhere") + " returned No such file or directory");
+    EXPECT_TRUE(lines.take().empty());
+    const auto noDirectory = manager().urlsForItemsInDirectoryAtURL(url("d/link"));
+    ASSERT_FALSE(noDirectory);
+    EXPECT_EQ(lines.take(), (std::vector<LogLine>{{3, "_IterateDirectory",
+                                                   "opendir of " + path("d/link") +
+                                                       " failed: " + errorText(noDirectory.error().code())}}));
+    makeFile("d/.zorvaned-copy-abcdef");
+    const auto leftovers = manager().copyLeftoversInDirectoryAtURL(url("d"));
+    ASSERT_EQ(leftovers.size(), 1U);
+    EXPECT_EQ(leftovers[0].lastPathComponent(), ".zorvaned-copy-abcdef");
+}
+
+// Goal: what a missing source, an occupied destination and a missing parent do, in all four forms. Method: a table.
+TEST_F(FileManager, MovesAndCopies) {
+    makeDirectory("full");
+    makeFile("full/f");
+    makeDirectory("empty");
+    const std::string none = " failed: No such file or directory";
+    expectPosix(manager().moveItemAtURL(url("no"), url("to")), ENOENT,
+                "rename of " + path("no") + " to " + path("to") + none);
+    expectPosix(manager().copyItemAtURL(url("no"), url("to")), ENOENT,
+                "clonetree of " + path("no") + " to " + path("to") + none);
+    EXPECT_TRUE(manager().moveItemIfExistsAtURL(url("no"), url("to")));
+    EXPECT_TRUE(manager().copyItemIfExistsAtURL(url("no"), url("to")));
+    EXPECT_EQ(item("to"), "missing");
+    makeFile("file");
+    expectPosix(manager().moveItemIfExistsAtURL(url("file/x"), url("to")), ENOTDIR,
+                "stat of " + path("file/x") + " failed: Not a directory");
+    expectPosix(manager().moveItemAtURL(url("empty"), url("full")), ENOTEMPTY,
+                "rename of " + path("empty") + " to " + path("full") + " failed: Directory not empty");
+    expectPosix(manager().moveItemAtURL(url("empty"), url("no/to")), ENOENT,
+                "rename of " + path("empty") + " to " + path("no/to") + none);
+    EXPECT_TRUE(manager().moveItemAtURL(url("full"), url("empty"))); // an empty directory gives way
+    EXPECT_EQ(names("empty"), (std::vector<std::string>{"f"}));
+    EXPECT_TRUE(manager().copyItemIfExistsAtURL(url("empty"), url("copy")));
+    EXPECT_EQ(content("copy/f"), "x");
+    makeLink("link", "copy");
+    EXPECT_TRUE(manager().moveItemAtURL(url("link"), url("moved"))); // the link itself
+    EXPECT_TRUE(item("moved").starts_with("120777"));
+    EXPECT_FALSE(manager().moveItemAtURL(url("moved/f"), url("stolen"))); // never through it
+    EXPECT_EQ(item("copy/f").substr(0, 6), "100644");
+}
+
+TEST_F(FileManager, AFailedCopyLeavesNothingUnderTheFinalName) {
+    makeDirectory("from");
+    makeFile("from/a");
+    makeFile("from/b");
+    for (std::size_t point = 1;; ++point) {
+        disk.arm({.point = point});
+        const auto copied = manager().copyItemAtURL(url("from"), url("to"));
+        const bool met = disk.met();
+        disk.disarm();
+        if (copied) {
+            EXPECT_EQ(names("to"), (std::vector<std::string>{"a", "b"})) << point;
+            EXPECT_EQ(content("to/a") + content("to/b"), "xx") << point;
+            ASSERT_TRUE(manager().removeItemAtURL(url("to")));
+        } else {
+            EXPECT_EQ(item("to"), "missing") << point;
+        }
+        for (const FileURL& leftover : manager().copyLeftoversInDirectoryAtURL(url("")))
+            EXPECT_TRUE(manager().removeItemAtURL(leftover));
+        EXPECT_EQ(names(""), (std::vector<std::string>{"from", "run"})) << point;
+        if (!met)
+            return;
+    }
+}
+
+// Goal: across file systems a move copies, then removes; a copy that fails leaves the source alone. Method: a child in
+// a mount namespace of its own with a small tmpfs below the root.
+TEST_F(FileManager, MovesAcrossFileSystems) {
+    if (!isRoot())
+        GTEST_SKIP() << "skipped: needs root to mount";
+    makeDirectory("other");
+    makeDirectory("from", 0711);
+    makeFile("from/small", "content", 0640);
+    makeFile("from/large", std::string(256 * 1024, 'l'));
+    ASSERT_EQ(::chown(path("from/small").c_str(), 501, 502), 0);
+    const pid_t child = ::fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+        constexpr int cannotMount = 77;
+        if (::unshare(CLONE_NEWNS) != 0 || ::mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
+            ::mount("tmpfs", path("other").c_str(), "tmpfs", 0, "size=128k") != 0)
+            ::_exit(cannotMount);
+        open();
+        int failed = 0;
+        const auto check = [&](bool holds, const char* what) {
+            if (!holds) {
+                std::fprintf(stderr, "does not hold: %s\n", what);
+                failed = 1;
+            }
+        };
+        const auto tooLarge = manager().moveItemAtURL(url("from"), url("other/to"));
+        check(!tooLarge && tooLarge.error().isPosix(ENOSPC), "a full file system fails the move");
+        check(!tooLarge && tooLarge.error().description()->starts_with("clonetree of " + path("from") + " to "),
+              "with the copy's error");
+        check(names("other").empty(), "nothing stays of the copy");
+        check(names("from") == std::vector<std::string>{"large", "small"}, "the source stays");
+        check(::unlink(path("from/large").c_str()) == 0, "unlink");
+        check(manager().moveItemAtURL(url("from"), url("other/to")).has_value(), "the move succeeds");
+        check(item("from") == "missing", "the source is gone");
+        check(content("other/to/small") == "content", "the content is there");
+        check(item("other/to/small") == "100640 501:502", "with mode and owner");
+        check(item("other/to").starts_with("040711"), "and those of the directory");
+        check(names("other") == std::vector<std::string>{"to"}, "under its one name");
+        // A source that cannot be removed is said and is no failure.
+        failNext(DiskCall::unlinkFile, EIO);
+        lines.take();
+        check(manager().moveItemAtURL(url("other/to/small"), url("back")).has_value(), "back again");
+        check(
+            lines.take(3, "moveAcrossFileSystems") ==
+                std::vector<std::string>{"Failed to remove source " + path("other/to/small") + " : Input/output error"},
+            "a source that stays is said");
+        check(content("back") == "content", "the moved file is whole");
+        ::_exit(failed);
+    }
+    int status = 0;
+    ASSERT_EQ(::waitpid(child, &status, 0), child);
+    ASSERT_TRUE(WIFEXITED(status));
+    if (WEXITSTATUS(status) == 77)
+        GTEST_SKIP() << "skipped: no mount namespace to be had";
+    EXPECT_EQ(WEXITSTATUS(status), 0);
+}
+
+bool setImmutable(const std::string& path, bool immutable) {
+    const platform::FileDescriptor file(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    int flags = 0;
+    if (::ioctl(file.get(), FS_IOC_GETFLAGS, &flags) != 0)
+        return false;
+    flags = immutable ? flags | FS_IMMUTABLE_FL : flags & ~FS_IMMUTABLE_FL;
+    return ::ioctl(file.get(), FS_IOC_SETFLAGS, &flags) == 0;
+}
+
+// Goal: removal goes as far as it can, is stopped by no immutable file, and its first failure is the error. Method:
+// trees with one item of each kind.
+TEST_F(FileManager, RemovesTrees) {
+    EXPECT_TRUE(manager().removeItemAtURL(url("missing")));
+    EXPECT_TRUE(manager().removeItemAtURL(url("missing/below")));
+    expectPosix(manager().removeItemAtURL(std::nullopt), EFAULT, "nil url passed to -removeItemAtURL:error:");
+    EXPECT_TRUE(lines.take().empty());
+    makeDirectory("outside");
+    makeFile("outside/kept");
+    makeDirectory("tree");
+    makeDirectory("tree/closed", 0);
+    makeLink("tree/link", "../outside");
+    makeFile("tree/a");
+    makeFile("tree/b");
+    disk.arm({.error = EACCES, .span = support::FaultSpan::fromThenOn, .filter = [](const auto& info) {
+                  return info.call == DiskCall::unlinkFile && info.subject == "a";
+              }});
+    const auto failed = manager().removeItemAtURL(url("tree"));
+    disk.disarm();
+    expectPosix(failed, EACCES, "prunetree of " + path("tree") + " failed: Permission denied");
+    EXPECT_EQ(names("tree"), (std::vector<std::string>{"a"}));
+    EXPECT_TRUE(hasLine(lines.take(), 3, "removeItemAtURL",
+                        "prunetree hit error for " + path("tree/a") + " : Permission denied"));
+    EXPECT_EQ(names("outside"), (std::vector<std::string>{"kept"}));
+    makeLink("tree/again", "../outside");
+    EXPECT_TRUE(manager().removeItemAtURL(url("tree/again")));
+    EXPECT_TRUE(manager().removeItemAtURL(url("tree")));
+    EXPECT_EQ(names(""), (std::vector<std::string>{"outside", "run"}));
+}
+
+TEST_F(FileManager, RemovesImmutableFiles) {
+    makeDirectory("tree");
+    makeFile("tree/file");
+    makeFile("tree/other");
+    if (!setImmutable(path("tree/file"), true))
+        GTEST_SKIP() << "skipped: no immutable files here";
+    const auto removed = manager().removeItemAtURL(url("tree"));
+    setImmutable(path("tree/file"), false);
+    EXPECT_TRUE(removed) << removed.error().text();
+    EXPECT_EQ(item("tree"), "missing");
+    const auto said = lines.take();
+    EXPECT_TRUE(hasLine(said, 3, "removeItemAtURL",
+                        "prunetree hit error for " + path("tree/file") + " : Operation not permitted"));
+    EXPECT_TRUE(hasLine(said, 5, "removeItemAtURL", "Unset UF_IMMUTABLE on " + path("tree/file")));
+}
+
+// Goal: everything but metadata files gets the owner and 0755 or 0644; what has a name outside keeps its own. Method:
+// one item of each kind, before and after.
+TEST_F(FileManager, StandardisesOwnership) {
+    if (!isRoot())
+        GTEST_SKIP() << "skipped: needs root to give files away";
+    makeDirectory("tree", 0700);
+    makeDirectory("tree/sub", 01777);
+    makeFile("tree/plain", "x", 0600);
+    makeFile("tree/program", "x", 0410);
+    makeFile("tree/setuid", "x", 04711);
+    makeFile(std::string("tree/sub/") + zor::names::metadataFile, "x", 0640);
+    makeLink("tree/link", "../outside");
+    makeFile("outside", "x", 0600);
+    makeFile("shared", "x", 0600);
+    ASSERT_EQ(::link(path("shared").c_str(), path("tree/shared").c_str()), 0);
+    ASSERT_TRUE(manager().standardizeOwnershipAtURL(url("tree"), 501, 502));
+    EXPECT_EQ(item("tree"), "040755 501:502");
+    EXPECT_EQ(item("tree/sub"), "040755 501:502");
+    EXPECT_EQ(item("tree/plain"), "100644 501:502");
+    EXPECT_EQ(item("tree/program"), "100755 501:502");
+    EXPECT_EQ(item("tree/setuid"), "100755 501:502");
+    EXPECT_EQ(item(std::string("tree/sub/") + zor::names::metadataFile), "100640 0:0");
+    EXPECT_EQ(item("tree/link"), "120777 501:502");
+    EXPECT_EQ(item("outside"), "100600 0:0");
+    EXPECT_EQ(item("shared"), "100600 0:0");
+    EXPECT_TRUE(lines.take().empty());
+    disk.arm({.error = EROFS, .span = support::FaultSpan::fromThenOn, .filter = [](const auto& info) {
+                  return info.call == DiskCall::changeOwner;
+              }});
+    EXPECT_TRUE(manager().standardizeOwnershipAtURL(url("tree/plain"), 33, 33));
+    disk.disarm();
+    EXPECT_TRUE(hasLine(lines.take(), 3, "standardizeOwnershipAtURL",
+                        "Could not chown " + path("tree/plain") + ": Read-only file system"));
+    expectPosix(manager().standardizeOwnershipAtURL(url("no"), 501, 501), ENOENT,
+                "Could not stat " + path("no") + ": No such file or directory");
+}
+
+TEST_F(FileManager, PrintsOrphansAndMeasures) {
+    makeDirectory("junk");
+    makeFile("junk/f", std::string(5000, 'x'));
+    makeLink("junk/dangling", "nowhere");
+    manager().printDirectoryStructureAtURL(url("junk"));
+    auto said = lines.take(3, "printDirectoryStructureAtURL");
+    std::ranges::sort(said);
+    EXPECT_EQ(said,
+              (std::vector<std::string>{"\tOrphaned File: " + path("junk"), "\tOrphaned File: " + path("junk/dangling"),
+                                        "\tOrphaned File: " + path("junk/f")}));
+    EXPECT_GE(manager().diskUsageForURL(url("junk")), 5000U);
+    EXPECT_EQ(manager().diskUsageForURL(url("junk/f")), 0U);
+    EXPECT_EQ(lines.take(3, "diskUsageForURL"),
+              (std::vector<std::string>{"Failed to open directory " + path("junk/f") + " : Not a directory"}));
+}
+
+} // namespace
+} // namespace zor::fs::test
