@@ -24,6 +24,16 @@ std::unexpected<Error> incomplete() {
     return std::unexpected(Error{.kind = Error::Kind::protocol, .code = 0, .message = "the reply is incomplete"});
 }
 
+/// A class's name as people type it: "data-application".
+std::string typedForm(std::string_view name) {
+    std::string typed;
+    for (const char character : name) {
+        const bool upper = character >= 'A' && character <= 'Z';
+        typed += character == '/' ? '-' : static_cast<char>(upper ? character - 'A' + 'a' : character);
+    }
+    return typed;
+}
+
 Value converted(const plist::Value& value);
 
 Map converted(const plist::Dictionary& dictionary) {
@@ -34,25 +44,27 @@ Map converted(const plist::Dictionary& dictionary) {
 }
 
 Value converted(const plist::Value& value) {
-    if (const bool* boolean = value.asBoolean())
-        return {*boolean};
-    if (const auto number = value.asSigned())
-        return {*number};
-    if (const auto number = value.asUnsigned())
-        return {*number};
-    if (const double* real = value.asReal())
-        return {*real};
-    if (const std::string* text = value.asString())
-        return {*text};
-    if (const plist::Dictionary* dictionary = value.asDictionary())
-        return {converted(*dictionary)};
-    if (const plist::Array* array = value.asArray()) {
-        List list;
+    Value made;
+    if (const bool* boolean = value.asBoolean()) {
+        made.content = *boolean;
+    } else if (const auto number = value.asSigned()) {
+        made.content = *number;
+    } else if (const auto unsignedNumber = value.asUnsigned()) {
+        made.content = *unsignedNumber;
+    } else if (const double* real = value.asReal()) {
+        made.content = *real;
+    } else if (const std::string* text = value.asString()) {
+        made.content = *text;
+    } else if (const plist::Dictionary* dictionary = value.asDictionary()) {
+        made.content = converted(*dictionary);
+    } else if (const plist::Array* array = value.asArray()) {
+        List& list = made.content.emplace<List>();
         for (const plist::Value& element : *array)
             list.push_back(converted(element));
-        return {std::move(list)};
+    } else {
+        made.content = plist::describe(&value); // dates and data, for people
     }
-    return {plist::describe(&value)}; // dates and data, for people
+    return made;
 }
 
 } // namespace
@@ -63,8 +75,19 @@ std::optional<std::uint64_t> containerClassOf(std::string_view nameOrNumber) {
     const auto [parsedTo, failure] = std::from_chars(nameOrNumber.data(), end, number);
     if (failure == std::errc() && parsedTo == end)
         return ipc::isContainerClass(number) ? std::optional(number) : std::nullopt;
-    const auto named = ipc::containerClassOfName(nameOrNumber);
-    return named ? std::optional(static_cast<std::uint64_t>(*named)) : std::nullopt;
+    const std::string wanted = typedForm(nameOrNumber);
+    std::optional<std::uint64_t> found;
+    for (std::uint64_t candidate = 1; ipc::isContainerClass(candidate) && !wanted.empty(); ++candidate) {
+        const std::string name = typedForm(ipc::containerClassNames[candidate]);
+        if (name == wanted)
+            return candidate;
+        if (!name.starts_with(wanted))
+            continue;
+        if (found)
+            return std::nullopt; // the beginning of two names
+        found = candidate;
+    }
+    return found;
 }
 
 std::string_view containerClassName(std::uint64_t number) {

@@ -37,7 +37,8 @@ struct ConnectOptions {
 /// The user id in a request that stands for the current mobile user.
 inline constexpr std::uint32_t currentMobileUser = 1;
 
-/// Number of a class by its name ("Data/Application") or decimal number (1 to 13).
+/// Number of a class by its name ("Data/Application"), the same as one types it ("data-application"), the beginning of one
+/// name alone ("data-app"), or its decimal number (1 to 13).
 [[nodiscard]] std::optional<std::uint64_t> containerClassOf(std::string_view nameOrNumber);
 /// Names of the classes; index is the number, index 0 is no class.
 [[nodiscard]] std::string_view containerClassName(std::uint64_t number);
