@@ -1,0 +1,102 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "ipc/Frame.h"
+#include "ipc/ContainerClasses.h"
+#include "ipc/Keys.h"
+#include "ipc/Uuid.h"
+
+#include <gtest/gtest.h>
+
+namespace zor::ipc {
+namespace {
+
+// Goal: the header's bytes are those that other programs write and read. Method: bytes written by hand.
+TEST(Frame, HeaderBytes) {
+    const std::array<std::uint8_t, frameHeaderBytes> bytes = {0x01, 0x02, 0x10, 0x00, 0x01, 0x00, 0x00, 0x00,
+                                                              0x88, 0x77, 0x66, 0x55, 0x44, 0x33, 0x22, 0x11};
+    const FrameHeader header = decodeFrameHeader(bytes);
+    EXPECT_EQ(header.payloadBytes, 0x0010'0201U);
+    EXPECT_EQ(header.flags, 1U);
+    EXPECT_EQ(header.id, 0x1122'3344'5566'7788U);
+    std::array<std::uint8_t, frameHeaderBytes> written{};
+    encodeFrameHeader(header, written);
+    EXPECT_EQ(written, bytes);
+}
+
+// Goal: each side takes exactly what the other may send. Method: lengths and flags around every limit.
+TEST(Frame, WhatEachSideTakes) {
+    struct Row {
+        std::uint32_t payloadBytes;
+        std::uint32_t flags;
+        bool request;
+        bool reply;
+    };
+    for (const Row& row : std::initializer_list<Row>{
+             {0, 0, false, false},
+             {0, 2, false, false},
+             {1, 0, true, false},
+             {1, 1, true, false},
+             {1, 2, false, true},
+             {1, 3, false, false},
+             {1, 4, false, false},
+             {1, 6, false, false},
+             {1, 0x8000'0000, false, false},
+             {1'048'576, 1, true, false},
+             {1'048'577, 1, false, false},
+             {1'048'577, 2, false, true},
+             {0xFFFF'FFFF, 1, false, false},
+             {0xFFFF'FFFF, 2, false, true},
+         }) {
+        const FrameHeader header = {.payloadBytes = row.payloadBytes, .flags = row.flags, .id = 0};
+        EXPECT_EQ(header.isValidRequest(), row.request) << row.payloadBytes << " " << row.flags;
+        EXPECT_EQ(header.isValidReply(), row.reply) << row.payloadBytes << " " << row.flags;
+    }
+}
+
+// Goal: a UUID is 16 bytes of data or nothing, and its text is exact. Method: values and texts that are nearly one.
+TEST(Uuid, ValuesAndText) {
+    const UuidBytes uuid = {0x00, 0x11, 0x22, 0x33, 0x44, 0x55, 0x66, 0x77,
+                            0x88, 0x99, 0xAA, 0xBB, 0xCC, 0xDD, 0xEE, 0xFF};
+    const plist::Value value = uuidValue(uuid);
+    EXPECT_EQ(uuidOf(&value), uuid);
+    for (const plist::Value& other : std::initializer_list<plist::Value>{
+             plist::Data(15), plist::Data(17), plist::Data(), "0011223344556677", std::uint64_t{1}, plist::Array()})
+        EXPECT_FALSE(uuidOf(&other));
+    EXPECT_FALSE(uuidOf(nullptr));
+    EXPECT_FALSE(uuidOf({{"A", value}}, "B"));
+
+    const std::string text = "00112233-4455-6677-8899-AABBCCDDEEFF";
+    EXPECT_EQ(uuidText(uuid), text);
+    EXPECT_EQ(uuidOfText(text), uuid);
+    EXPECT_EQ(uuidOfText("00112233-4455-6677-8899-aabbccddeeff"), uuid);
+    for (const char* wrong : {"", "00112233445566778899AABBCCDDEEFF", "00112233-4455-6677-8899-AABBCCDDEEF",
+                              "00112233-4455-6677-8899-AABBCCDDEEFF0", "0011223-34455-6677-8899-AABBCCDDEEFF",
+                              "00112233-4455-6677-8899-AABBCCDDEEFG", "0011223344-55-6677-8899-AABBCCDDEEFF",
+                              "00112233-4455-6677-8899+AABBCCDDEEFF", "{0112233-4455-6677-8899-AABBCCDDEEFF"})
+        EXPECT_FALSE(uuidOfText(wrong)) << wrong;
+}
+
+// Goal: the numbers that metadata files and messages carry keep their names. Method: the table, and names that are
+// none.
+TEST(ContainerClasses, NumbersAndNames) {
+    EXPECT_EQ(containerClassOfName("Data/KolvexPlugin"), ContainerClass::dataKolvexPlugin);
+    EXPECT_EQ(containerClassOfName("Shared/SystemGroup"), ContainerClass::sharedSystemGroup);
+    for (const char* wrong : {"", "Undefined", "data/application", "Data/Application/", "Application"})
+        EXPECT_FALSE(containerClassOfName(wrong)) << wrong;
+    std::string bundles;
+    std::string systems;
+    for (std::uint64_t number = 0; number < 16; ++number) {
+        EXPECT_EQ(isContainerClass(number), number >= 1 && number <= 13);
+        const auto containerClass = static_cast<ContainerClass>(number);
+        if (isBundleClass(containerClass))
+            bundles += std::string(containerClassNames[number]) + " ";
+        if (isSystemClass(containerClass))
+            systems += std::string(containerClassNames[number]) + " ";
+    }
+    EXPECT_EQ(bundles, "Bundle/Application Bundle/KolvexPlugin Bundle/VPNPlugin Bundle/Framework ");
+    EXPECT_EQ(systems, "Data/System Shared/SystemGroup ");
+}
+
+static_assert(static_cast<std::uint64_t>(Command::retryTest) + 1 == commandCount);
+
+} // namespace
+} // namespace zor::ipc
