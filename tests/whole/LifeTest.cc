@@ -1,0 +1,174 @@
+// SPDX-License-Identifier: Apache-2.0
+// The daemon's life as its users see it: killed at any moment, started twice, told to stop, asked by its tool.
+#include "whole/DaemonProcess.h"
+
+#include <atomic>
+#include <filesystem>
+#include <gtest/gtest.h>
+#include <random>
+#include <set>
+#include <thread>
+
+namespace zor::whole {
+
+namespace {
+
+constexpr std::uint64_t dataApplication = 2;
+
+/// What a container of class 2 must have wherever one is found under its final name.
+void expectWhole(const std::string& path) {
+    for (const char* item : {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp",
+                             ".com.veltra.zorvane.metadata.plist"}) {
+        struct stat status {};
+        ASSERT_EQ(::lstat((path + "/" + item).c_str(), &status), 0) << path << "/" << item;
+        const bool metadata = item[0] == '.';
+        EXPECT_EQ(status.st_mode & 07777, metadata ? 0644u : 0755u) << path << "/" << item;
+        if (::geteuid() == 0) {
+            EXPECT_EQ(status.st_uid, metadata ? 0u : 501u) << path << "/" << item;
+        }
+    }
+}
+
+} // namespace
+
+// Goal: nothing acknowledged is lost and nothing is there by halves, whenever the daemon is killed. Method: several clients create
+// without pause, SIGKILL after a random time, restart, every acknowledged container is looked up and every directory judged.
+TEST(Life, KilledAtAnyMomentFindsEveryAcknowledgedContainerWhole) {
+    DaemonProcess daemon;
+    std::mt19937 random(20261124);
+    std::map<std::string, std::string> acknowledged; // identifier to UUID
+    std::mutex mutex;
+    const int rounds = raceSeconds() > 10 ? 40 : 6;
+    for (int round = 0; round < rounds; ++round) {
+        daemon.start();
+        std::vector<std::thread> creators;
+        for (int thread = 0; thread < 4; ++thread)
+            creators.emplace_back([&, thread] {
+                auto client = daemon.client();
+                for (int i = 0;; ++i) {
+                    const std::string identifier =
+                        "org.example.r" + std::to_string(round) + ".t" + std::to_string(thread) + "." + std::to_string(i);
+                    const auto made = client.createOrLookup(
+                        {.containerClass = dataApplication, .user = 501, .identifier = identifier, .create = true});
+                    if (!made)
+                        return;
+                    const std::lock_guard held(mutex);
+                    acknowledged[identifier] = zorvane::uuidText(made->uuid);
+                }
+            });
+        std::this_thread::sleep_for(std::chrono::milliseconds(std::uniform_int_distribution(5, 150)(random)));
+        daemon.kill();
+        for (std::thread& creator : creators)
+            creator.join();
+    }
+    daemon.start();
+    auto client = daemon.client();
+    ASSERT_GT(acknowledged.size(), 10u);
+    for (const auto& [identifier, uuid] : acknowledged) {
+        const auto found =
+            client.createOrLookup({.containerClass = dataApplication, .user = 501, .identifier = identifier});
+        ASSERT_TRUE(found) << identifier << ": " << found.error().message;
+        EXPECT_TRUE(found->existed);
+        EXPECT_EQ(zorvane::uuidText(found->uuid), uuid) << identifier;
+    }
+    ASSERT_TRUE(client.emptyDeathRow());
+    for (const auto& entry :
+         std::filesystem::directory_iterator(daemon.path("private/var/mobile/Containers/Data/Application")))
+        expectWhole(entry.path());
+    const std::string caches = daemon.path("private/var/root/Library/Caches/com.veltra.zorvaned/");
+    EXPECT_TRUE(std::filesystem::is_empty(caches + "Staging"));
+    EXPECT_TRUE(std::filesystem::is_empty(caches + "Dead"));
+}
+
+// Goal: one daemon a root, an end on request, and start-up errors that say what to do.
+TEST(Life, SecondDaemonAndSigtermAndBrokenCommandLines) {
+    DaemonProcess daemon;
+    daemon.start();
+    const auto second = daemon.runAnother();
+    EXPECT_EQ(second.exitStatus, 1);
+    EXPECT_NE(second.output.find("zorvaned: "), std::string::npos) << second.output;
+    EXPECT_EQ(daemon.terminate(), 0);
+    for (const auto& [arguments, status] : std::vector<std::pair<std::vector<std::string>, int>>{
+             {{"--root"}, 2}, {{"--log-level", "x"}, 2}, {{"--nothing"}, 2}, {{"stray"}, 2},
+             {{"--help"}, 0}, {{"--version"}, 0},        {{"--root", "/nowhere"}, 1}}) {
+        std::vector<std::string> all = {programPath("zorvaned")};
+        all.insert(all.end(), arguments.begin(), arguments.end());
+        EXPECT_EQ(runProgram(all).exitStatus, status) << arguments[0];
+    }
+}
+
+// Goal: transient containers end with the boot, others stay; a root that "reboots" does the boot's work once.
+TEST(Life, RebootClearsTransientContainersAndOrphans) {
+    DaemonProcess daemon;
+    daemon.start();
+    std::string transientPath;
+    {
+        auto client = daemon.client();
+        const auto kept =
+            client.createOrLookup({.containerClass = dataApplication, .user = 501, .identifier = "kept", .create = true});
+        const auto transient = client.createOrLookup({.containerClass = dataApplication,
+                                                      .user = 501,
+                                                      .identifier = "passing",
+                                                      .create = true,
+                                                      .transient = true});
+        ASSERT_TRUE(kept && transient);
+        transientPath = transient->path;
+    }
+    daemon.kill();
+    const std::string classDirectory = daemon.path("private/var/mobile/Containers/Data/Application/");
+    std::filesystem::create_directory(classDirectory + "Junk");
+    std::filesystem::create_directory(classDirectory + "6F9619FF-8B86-D011-B42D-00C04FC964FF");
+    daemon.start();
+    EXPECT_TRUE(std::filesystem::exists(transientPath)) << "an ordinary restart is no boot";
+    EXPECT_TRUE(std::filesystem::exists(classDirectory + "Junk"));
+    daemon.kill();
+    daemon.start({"--forget-boot"});
+    EXPECT_FALSE(std::filesystem::exists(transientPath));
+    EXPECT_FALSE(std::filesystem::exists(classDirectory + "Junk"));
+    EXPECT_FALSE(std::filesystem::exists(classDirectory + "6F9619FF-8B86-D011-B42D-00C04FC964FF"));
+    EXPECT_TRUE(daemon.client().createOrLookup({.containerClass = dataApplication, .user = 501, .identifier = "kept"}));
+}
+
+// Goal: the tool's exit codes and outputs are what scripts rely on. Method: a table of calls on a real daemon.
+TEST(Tool, ExitCodesAndOutput) {
+    DaemonProcess daemon;
+    daemon.start();
+    const std::string root = daemon.root();
+    struct Row {
+        std::vector<std::string> arguments;
+        int exitStatus;
+        const char* inOutput;
+    };
+    const std::vector<Row> rows = {
+        {{"create", "a.b", "--class", "data-app", "--user", "501"}, 0, "a.b created"},
+        {{"lookup", "a.b", "--class", "2"}, 0, "a.b exists"},
+        {{"--json", "lookup", "a.b", "--class", "Data/Application"}, 0, "\"existed\": true"},
+        {{"lookup", "nobody", "--class", "2"}, 1, "code 21"},
+        {{"--json", "lookup", "nobody", "--class", "2"}, 1, "\"code\": 21"},
+        {{"create", "a.b", "--class", "2", "--user", "99"}, 1, "code 38"},
+        {{"list", "--class", "data-app"}, 0, "a.b"},
+        {{"--json", "list", "--class", "bundle-app"}, 0, "[]"},
+        {{"create", "tool", "--class", "bundle-app"}, 0, "tool created"},
+        {{"empty-death-row"}, 0, "Death row is empty"},
+        {{"status"}, 0, "MessagesServed"},
+        {{"--json", "status"}, 0, "\"Counters\""},
+        {{"lookup", "a.b"}, 2, "--class"},
+        {{"lookup", "a.b", "--class", "shared"}, 2, "no class"},
+        {{}, 2, "subcommand"},
+        {{"--help"}, 0, "Examples"},
+        {{"--root", "/nowhere", "status"}, 3, "cannot reach zorvaned"},
+        {{"--root", "/nowhere", "--json", "list", "--class", "2"}, 3, "\"unreachable\""},
+    };
+    for (const Row& row : rows) {
+        std::vector<std::string> all = {programPath("zorvanectl"), "--root", root};
+        if (!row.arguments.empty() && row.arguments[0] == "--root")
+            all.resize(1);
+        all.insert(all.end(), row.arguments.begin(), row.arguments.end());
+        const auto outcome = runProgram(all);
+        EXPECT_EQ(outcome.exitStatus, row.exitStatus) << ::testing::PrintToString(row.arguments) << outcome.output;
+        EXPECT_NE(outcome.output.find(row.inOutput), std::string::npos)
+            << ::testing::PrintToString(row.arguments) << outcome.output;
+    }
+}
+
+} // namespace zor::whole
