@@ -15,7 +15,7 @@ namespace zor::whole {
 class DaemonProcess {
 public:
     enum class Syncs { off, on };
-    explicit DaemonProcess(Syncs syncs = Syncs::off, const std::string& parent = "/tmp");
+    explicit DaemonProcess(Syncs syncs = Syncs::off, const std::string& parent = "/dev/shm");
     ~DaemonProcess();
     DaemonProcess(const DaemonProcess&) = delete;
     DaemonProcess& operator=(const DaemonProcess&) = delete;
