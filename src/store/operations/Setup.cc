@@ -64,8 +64,10 @@ void ZORClientConnection::rebootContainerManagerSetup() {
 
 bool ZORClientConnection::isOrphan(const FileURL& entry, ContainerClass containerClass) {
     const std::string_view name = entry.lastPathComponent();
-    const bool acceptable =
-        UUID::parse(name) || services_.whitelist.directoryNameIsWellknown(name, containerClass);
+    // An identifier of the table whose container goes by another name is a name all the same: what lies there is not ours to
+    // judge by a table that may have changed.
+    const bool acceptable = UUID::parse(name) || services_.whitelist.containerIdIsWellknown(name, containerClass) ||
+                            services_.whitelist.directoryNameIsWellknown(name, containerClass);
     if (!acceptable)
         return true;
     if (!services_.fileManager.itemDoesNotExistAtURL(entry.appendingFile(names::metadataFile)))
