@@ -27,6 +27,12 @@ ZORError ZORContainerCache::failedToRebuild(Here here, const Key& key, const ZOR
                      key.userId, className(key.containerClass), suffix(key.transient));
 }
 
+void ZORContainerCache::traceIdentifier(Here here, const Key& key, const char* what, const std::string& identifier) {
+    if (log_.writes(logLevelDebug))
+        log_.write(logLevelDebug, here.function, "Cache: %s%s: %s Identifier: %s", className(key.containerClass),
+                   suffix(key.transient), what, ZOR_SHOWN(identifier));
+}
+
 Result<ZORContainerCache::ClassCache*> ZORContainerCache::_getCacheForUserId(const Key& key) {
     if (!userIdIsValidForClass(key.containerClass, key.userId))
         return makeError(log_, ZOR_HERE, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
@@ -91,8 +97,7 @@ Result<void> ZORContainerCache::checkOnDisk(Here here, const Key& key, const ZOR
     const auto item = fileManager_.resolver().openItem(file, O_PATH);
     struct stat status {};
     if (item && ::fstat(item->get(), &status) == 0 && S_ISREG(status.st_mode)) {
-        ZOR_LOG(log_, logLevelDebug, "Cache: %s%s: %s Identifier: %s", className(key.containerClass),
-                suffix(key.transient), foundFormatPrefix, ZOR_SHOWN(record.identifier()));
+        traceIdentifier(here, key, foundFormatPrefix, record.identifier());
         return {};
     }
     if (!item && item.error() != ENOENT)
@@ -116,6 +121,10 @@ Result<ZORContainerCache::Record> ZORContainerCache::containerForUser(std::uint3
                              "(null)");
         const Key key{userId, containerClass, transient};
         Record record = TRY(findRecord(key, *identifier));
+        if (!record->hasUrl())
+            return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
+                             "Cache: %s%s: Invalid URL path string: %s", className(containerClass), suffix(transient),
+                             "(null)");
         TRY(checkOnDisk(here, key, *record, "Found"));
         return record;
     });
@@ -176,8 +185,7 @@ Result<void> ZORContainerCache::addContainerMetadata(const Record& record, std::
             record->setPlace(std::move(place));
             store(**cache, record);
         }
-        ZOR_LOG(log_, logLevelDebug, "Cache: %s%s: Added Identifier: %s", className(key.containerClass),
-                suffix(transient), ZOR_SHOWN(record->identifier()));
+        traceIdentifier(here, key, "Added", record->identifier());
         return {};
     });
 }
@@ -202,8 +210,7 @@ Result<void> ZORContainerCache::removeContainerForUser(std::uint32_t userId, Con
             if (known != (*cache)->end())
                 (*cache)->erase(known);
         }
-        ZOR_LOG(log_, logLevelDebug, "Cache: %s%s: Removed Identifier: %s", className(containerClass),
-                suffix(transient), ZOR_SHOWN(*identifier));
+        traceIdentifier(here, key, "Removed", *identifier);
         return {};
     });
 }

@@ -84,6 +84,8 @@ private:
     /// Code 44 or 47 unless the record's metadata file is there.
     Result<void> checkOnDisk(Here here, const Key& key, const ZORMetadata& record, const char* foundFormatPrefix);
     static void store(ClassCache& cache, Record record);
+    /// A level-7 line under the operation's own name, which a lambda inside it does not have.
+    void traceIdentifier(Here here, const Key& key, const char* what, const std::string& identifier);
 
     const Log& log_;
     ZORFileManager& fileManager_;
