@@ -51,7 +51,7 @@ std::expected<DaemonOptions, OptionsEnd> parseDaemonOptions(int argumentCount, c
     };
     DaemonOptions options;
     opterr = 0;
-    optind = 1;
+    optind = 0; // glibc: also forget where an earlier call stopped inside an argument
     for (;;) {
         const int next = ::getopt_long(argumentCount, arguments, ":", known, nullptr);
         switch (next) {
