@@ -141,7 +141,7 @@ const std::vector<FidelityCase>& fidelityCases() {
          }},
         {"link of another owner",
          [](const auto& path) {
-             makeLink(AT_FDCWD, path, "/etc/passwd");
+             makeLink(AT_FDCWD, path, "no where");
              return ::lchown(path.c_str(), 501, 502) == 0;
          }},
         {"dangling link", [](const auto& path) { return ::symlink("no where", path.c_str()) == 0; }},
@@ -400,7 +400,7 @@ TEST(CopyTree, FillsOnlyTheDirectoryItMade) {
     makeFile(world.fd(), "victim/keep");
     std::size_t refused = 0;
     const auto end = std::chrono::steady_clock::now() + raceTime();
-    for (std::size_t copies = 0; std::chrono::steady_clock::now() < end && refused < 20; ++copies) {
+    while (std::chrono::steady_clock::now() < end && refused < 20) {
         std::atomic<bool> stopped{false};
         std::thread swapper([&] {
             while (!stopped && ::renameat2(world.fd(), ".copy", world.fd(), "victim", RENAME_EXCHANGE) != 0) {
@@ -417,7 +417,6 @@ TEST(CopyTree, FillsOnlyTheDirectoryItMade) {
         ASSERT_EQ(statusOf(world.path() + "/victim").st_mode & 0777, 0700U);
         ASSERT_EQ(removeTree(world.disk, world.fd(), ".copy"), 0);
     }
-    std::printf("refused %zu times\n", refused);
 }
 
 // Deeper than descriptors and paths reach.
@@ -442,28 +441,33 @@ TEST(CopyTree, CopiesAnyDepth) {
 // in a copy, nothing outside changes, nothing blocks.
 TEST(CopyTree, TakesNothingFromOutside) {
     World world;
-    const support::ProcessResources before;
-    world.makeTree();
-    std::size_t copies = 0;
-    std::size_t whole = 0;
-    {
-        const Vandal vandal(world);
-        const auto end = std::chrono::steady_clock::now() + raceTime();
-        for (; std::chrono::steady_clock::now() < end; ++copies) {
-            whole += copyTree(world.disk, world.fd(), "tree", world.fd(), ".copy") == 0 ? 1 : 0;
-            if (!exists(world.fd(), ".copy"))
-                continue;
-            const support::FileTree copy = support::readTree(world.path() + "/.copy");
-            for (const auto& [id, inode] : copy.inodes) {
-                const std::string content(inode.content.begin(), inode.content.end());
-                ASSERT_NE(content.substr(0, 6), World::secret);
+    const bool permitted = world.confined([&] {
+        world.makeTree();
+        const std::size_t descriptorsBefore = openDescriptorCount();
+        std::size_t copies = 0;
+        {
+            const Vandal vandal(world);
+            const auto end = std::chrono::steady_clock::now() + raceTime();
+            for (; std::chrono::steady_clock::now() < end; ++copies) {
+                // A single file is copied so often that its change into a FIFO falls between the look and the opening.
+                std::string source = "tree/wide/f" + std::to_string(copies % World::wideCount);
+                if (copies % 50 < 4)
+                    source = copies % 50 == 0 ? "tree" : "tree/wide";
+                copyTree(world.disk, world.fd(), source.c_str(), world.fd(), ".copy");
+                if (!exists(world.fd(), ".copy"))
+                    continue;
+                if (copies % 50 < 4)
+                    for (const auto& [id, inode] : support::readTree(world.path() + "/.copy").inodes)
+                        ASSERT_NE(std::string(inode.content.begin(), inode.content.end()), World::secret);
+                ASSERT_EQ(removeTree(world.disk, world.fd(), ".copy"), 0);
             }
-            ASSERT_EQ(removeTree(world.disk, world.fd(), ".copy"), 0);
         }
-    }
-    EXPECT_EQ(world.damage(), "");
-    EXPECT_EQ(before.leakedSince(), "");
-    EXPECT_GT(copies, 3U);
+        EXPECT_EQ(world.damage(), "");
+        EXPECT_EQ(openDescriptorCount(), descriptorsBefore);
+        EXPECT_GT(copies, 3U);
+    });
+    if (!permitted)
+        GTEST_SKIP() << "chroot is not permitted";
 }
 
 } // namespace

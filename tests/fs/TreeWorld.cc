@@ -4,11 +4,11 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
-#include <dirent.h>
 #include <fcntl.h>
-#include <memory>
+#include <gtest/gtest.h>
 #include <random>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <system_error>
 #include <unistd.h>
 
@@ -23,6 +23,13 @@ void check(int result, const std::string& what) {
         throw std::system_error(errno, std::generic_category(), what);
 }
 
+std::string upwards(std::size_t levels) {
+    std::string path;
+    while (levels-- > 0)
+        path += "../";
+    return path;
+}
+
 } // namespace
 
 bool isLongRun() {
@@ -35,11 +42,12 @@ std::chrono::seconds raceTime() {
 }
 
 std::size_t openDescriptorCount() {
-    const std::unique_ptr<DIR, int (*)(DIR*)> stream(::opendir("/proc/self/fd"), ::closedir);
+    // Not from /proc, which a confined test does not have.
+    constexpr int descriptorsMax = 1024;
     std::size_t count = 0;
-    while (const dirent* entry = ::readdir(stream.get()))
-        count += entry->d_name[0] != '.' ? 1 : 0;
-    return count - 1;
+    for (int fd = 0; fd < descriptorsMax; ++fd)
+        count += ::fcntl(fd, F_GETFD) >= 0 ? 1 : 0;
+    return count;
 }
 
 FileDescriptor openDirectory(int parent, const std::string& path) {
@@ -117,11 +125,46 @@ void World::makeTree() {
         makeDirectory(fd(), directory);
         makeFile(fd(), directory + "/f");
         makeFile(fd(), directory + "/g");
-        makeLink(fd(), directory + "/l", path() + "/outside");
+        makeLink(fd(), directory + "/l", upwards(depth + 1) + "outside");
         makeDirectory(fd(), directory + "/e");
         makeFile(fd(), directory + "/e/f");
         makeFifo(fd(), directory + "/fifo");
     }
+    makeDirectory(fd(), "tree/wide");
+    for (std::size_t i = 0; i < wideCount; ++i) {
+        const std::string number = std::to_string(i);
+        makeDirectory(fd(), "tree/wide/e" + number);
+        makeFile(fd(), "tree/wide/e" + number + "/f");
+        makeLink(fd(), "tree/wide/l" + number, upwards(2) + "outside");
+        makeFile(fd(), "tree/wide/f" + number);
+        makeFifo(fd(), "tree/wide/p" + number);
+    }
+}
+
+bool World::confined(const std::function<void()>& body) {
+    constexpr int passed = 0;
+    constexpr int failed = 1;
+    constexpr int notPermitted = 2;
+    std::fflush(nullptr);
+    const pid_t child = ::fork();
+    check(child, "fork");
+    if (child == 0) {
+        if (::chroot(path().c_str()) != 0 || ::chdir("/") != 0)
+            ::_exit(notPermitted);
+        confined_ = true;
+        try {
+            body();
+        } catch (const std::exception& error) {
+            ADD_FAILURE() << error.what();
+        }
+        std::fflush(nullptr);
+        ::_exit(testing::Test::HasFailure() ? failed : passed);
+    }
+    int status = 0;
+    check(::waitpid(child, &status, 0), "waitpid");
+    EXPECT_TRUE(WIFEXITED(status)) << "ended by signal " << WTERMSIG(status);
+    EXPECT_NE(WEXITSTATUS(status), failed) << "see above";
+    return !WIFEXITED(status) || WEXITSTATUS(status) != notPermitted;
 }
 
 std::string World::outside() const {
@@ -133,7 +176,10 @@ std::string World::damage() const {
     return now == before_ ? "" : "outside was\n" + before_ + "and is\n" + now;
 }
 
-Vandal::Vandal(const World& world) : world_(world), thread_([this] { run(); }) {}
+Vandal::Vandal(const World& world) : world_(world), thread_([this] { run(); }) {
+    while (!begun_)
+        std::this_thread::yield();
+}
 
 Vandal::~Vandal() {
     stopped_ = true;
@@ -142,46 +188,44 @@ Vandal::~Vandal() {
 
 void Vandal::run() {
     std::mt19937 random(static_cast<unsigned>(::getpid()));
-    for (; !stopped_; ::usleep(random() % 200)) {
-        switch (random() % 4) {
-        case 0:
+    while (!stopped_) {
+        for (int exchanges = 0; exchanges < 100 && !stopped_; ++exchanges)
             exchange(random());
-            break;
-        case 1:
-            replaceFile(random());
-            break;
-        default:
-            moveOutAndBack(random());
-            break;
-        }
+        begun_ = true;
+        replaceFile(random());
+        moveOutAndBack(random());
     }
 }
 
 /// A directory of the chain stands in outside/parking for a moment, with a link to there in its place.
 void Vandal::moveOutAndBack(unsigned random) {
-    const std::string path = "tree/" + chainPath(1 + random % World::chainDepth);
+    const std::size_t depth = 1 + random % World::chainDepth;
+    const std::string path = "tree/" + chainPath(depth);
     if (::renameat(world_.fd(), path.c_str(), world_.fd(), "outside/parking/moved") != 0)
         return;
-    const std::string target = world_.path() + "/outside" + (random & 0x1000 ? "" : "/parking/moved");
+    const std::string target = upwards(depth) + "outside" + (random & 0x1000 ? "" : "/parking/moved");
     [[maybe_unused]] int ignored = ::symlinkat(target.c_str(), world_.fd(), path.c_str());
-    ::usleep((random >> 16) % 2000);
+    ::usleep((random >> 16) % 1000);
     ::unlinkat(world_.fd(), path.c_str(), 0);
     if (::renameat(world_.fd(), "outside/parking/moved", world_.fd(), path.c_str()) != 0)
         ::renameat(world_.fd(), "outside/parking/moved", world_.fd(), "tree/returned");
 }
 
-/// The small directory and the link to outside, which has one of the same names in it, change places.
+/// A directory and a link to outside, or a file and a FIFO, change places.
 void Vandal::exchange(unsigned random) {
-    const std::string path = "tree/" + chainPath(1 + random % World::chainDepth);
-    ::renameat2(world_.fd(), (path + "/e").c_str(), world_.fd(), (path + "/l").c_str(), RENAME_EXCHANGE);
+    const std::string number = std::to_string(random / 2 % World::wideCount);
+    const std::string from = (random % 2 == 0 ? "tree/wide/e" : "tree/wide/f") + number;
+    const std::string to = (random % 2 == 0 ? "tree/wide/l" : "tree/wide/p") + number;
+    ::renameat2(world_.fd(), from.c_str(), world_.fd(), to.c_str(), RENAME_EXCHANGE);
 }
 
 void Vandal::replaceFile(unsigned random) {
-    const std::string path = "tree/" + chainPath(1 + random % World::chainDepth) + "/f";
+    const std::size_t depth = 1 + random % World::chainDepth;
+    const std::string path = "tree/" + chainPath(depth) + "/f";
     ::unlinkat(world_.fd(), path.c_str(), 0);
     [[maybe_unused]] int ignored = 0;
     if ((random & 0x1000) != 0)
-        ignored = ::symlinkat((world_.path() + "/outside/file").c_str(), world_.fd(), path.c_str());
+        ignored = ::symlinkat((upwards(depth + 1) + "outside/file").c_str(), world_.fd(), path.c_str());
     else if ((random & 0x2000) != 0)
         ignored = ::mkfifoat(world_.fd(), path.c_str(), 0600);
     else

@@ -9,6 +9,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <functional>
 #include <string>
 #include <thread>
 
@@ -32,11 +33,12 @@ void makeChain(int parent, std::size_t depth);
 /// "a0", "a0/a1" and so on.
 std::string chainPath(std::size_t depth);
 
-/// tree/: a0/a1/…, each with a file, a link, a FIFO and a small directory. outside/: files of another owner, and
-/// outside/parking/, which the vandal may move directories to.
+/// tree/: a0/a1/…, each with a file, a link, a FIFO and a small directory; wide/: many of each. outside/: files of
+/// another owner, and outside/parking/, which the vandal may move directories to.
 class World {
 public:
     static constexpr std::size_t chainDepth = 60;
+    static constexpr std::size_t wideCount = 50;
     /// Content of every file outside, and the size of one of them in bytes.
     static constexpr const char* secret = "SECRET";
     static constexpr off_t outsideBytes = 8 * 1024 * 1024;
@@ -47,7 +49,12 @@ public:
     /// What changed outside the tree since the world was made; empty when nothing did.
     [[nodiscard]] std::string damage() const;
     [[nodiscard]] int fd() const { return root_.get(); }
-    [[nodiscard]] const std::string& path() const { return directory_.path(); }
+    [[nodiscard]] std::string path() const { return confined_ ? "" : directory_.path(); }
+
+    /// Runs `body` in a child for which this world is the whole file system. A walk that is wrong and leaves the tree
+    /// would else take its mistake to the machine, as root. False: not permitted here. What `body` expects in vain is a
+    /// failure.
+    bool confined(const std::function<void()>& body);
 
     platform::LinuxDisk disk{platform::Syncs::off};
 
@@ -55,11 +62,13 @@ private:
     [[nodiscard]] std::string outside() const;
 
     support::TemporaryDirectory directory_;
+    bool confined_ = false;
     platform::FileDescriptor root_;
     std::string before_;
 };
 
-/// Until it goes: moves directories of the tree out and back, puts links and FIFOs in their place, adds names.
+/// From the end of its construction until it goes: moves directories of the tree out and back, puts links and FIFOs in
+/// their place, adds names.
 class Vandal {
 public:
     explicit Vandal(const World& world);
@@ -74,6 +83,7 @@ private:
     void replaceFile(unsigned random);
 
     const World& world_;
+    std::atomic<bool> begun_{false};
     std::atomic<bool> stopped_{false};
     std::thread thread_;
 };
