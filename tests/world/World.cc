@@ -37,7 +37,7 @@ platform::Platform withRoles(const platform::Platform& real, World& world) {
             .bootMarker = world.bootMarker,
             .transactions = real.transactions,
             .deathRowQueue = real.deathRowQueue,
-            .lockStateQueue = real.lockStateQueue,
+            .lockStateQueue = world.lockStateQueue,
             .runLoop = real.runLoop,
             .peers = real.peers,
             .listener = real.listener,
@@ -89,6 +89,7 @@ void World::start() {
     auto opened = platform::LinuxPlatform::open({.rootDirectory = directory_.path(), .syncs = options_.syncs});
     require(opened.has_value(), "no platform");
     platform_ = std::move(*opened);
+    lockStateQueue.inner = &platform_->roles().lockStateQueue;
     sandbox.inner = &platform_->roles().sandbox;
     composition_ = std::make_unique<Composition>(withRoles(platform_->roles(), *this), options_.probe);
 }

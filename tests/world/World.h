@@ -61,6 +61,23 @@ public:
     std::function<void()> notify;
 };
 
+/// Counts what the queue behind it is told.
+class CountingQueue final : public platform::WorkQueue {
+public:
+    void async(std::function<void()> job) override { inner->async(std::move(job)); }
+    void suspend() override {
+        ++suspended;
+        inner->suspend();
+    }
+    void resume() override {
+        ++resumed;
+        inner->resume();
+    }
+    platform::WorkQueue* inner = nullptr;
+    std::atomic<int> suspended{0};
+    std::atomic<int> resumed{0};
+};
+
 /// Passes on what it is told until it is to fail.
 class FailingSandbox final : public platform::SandboxUserState {
 public:
@@ -98,6 +115,8 @@ public:
     void restart();
     [[nodiscard]] Composition& services() { return *composition_; }
     [[nodiscard]] ZORClientConnection& daemonsClient() { return *composition_->sharedClientConnection(); }
+    /// Reads what the services are made from, as they do when they are first asked for.
+    void load() { (void)composition_->store(); }
     /// A client of one message.
     [[nodiscard]] std::shared_ptr<ZORClientConnection> client(ZORClientConnection::Client client);
     [[nodiscard]] platform::LinuxPlatform& linux() { return *platform_; }
@@ -124,6 +143,7 @@ public:
     SettableBuild internalBuild;
     FlagBootMarker bootMarker;
     SettableLockState lockState;
+    CountingQueue lockStateQueue;
     FailingSandbox sandbox;
     support::FaultDisk& disk() { return faults_; }
 

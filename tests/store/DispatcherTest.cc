@@ -1,0 +1,335 @@
+// SPDX-License-Identifier: Apache-2.0
+// The way of a message: who is admitted to which command, what is said and done to those who are not, who sends the reply,
+// and the commands for containers from a request's keys to a reply's.
+#include "daemon/commands/Commands.h"
+#include "platform/EntitlementKeys.h"
+#include "world/World.h"
+
+#include <chrono>
+#include <gtest/gtest.h>
+#include <set>
+#include <thread>
+
+namespace zor::test {
+namespace {
+
+using plist::Array;
+using plist::Dictionary;
+using support::LogLine;
+
+namespace powers = platform::entitlementKeys;
+using Kind = platform::ServiceEvent::Kind;
+
+constexpr pid_t peerPid = 4711;
+constexpr const char* handler = "ZORProcessIpsiEvent";
+constexpr const char* admission = "checkEntitlementsAndInitClientObject";
+
+class FakePeer final : public platform::Peer {
+public:
+    [[nodiscard]] platform::Identity identify(Explain) override { return identity; }
+    [[nodiscard]] pid_t pid() const override { return identity.pid; }
+    [[nodiscard]] uid_t kernelUserId() const override { return identity.effectiveUserId; }
+    platform::Identity identity;
+};
+
+class FakeConnection final : public platform::PeerConnection {
+public:
+    platform::Peer& peer() override { return peer_; }
+    void cancel() override { ++cancelled; }
+    FakePeer peer_;
+    int cancelled = 0;
+};
+
+class FakeReply final : public platform::ReplyChannel {
+public:
+    void send(const Dictionary& reply) override {
+        const platform::MutexLock held(mutex_);
+        replies_.push_back(reply);
+    }
+    [[nodiscard]] std::vector<Dictionary> replies() const {
+        const platform::MutexLock held(mutex_);
+        return replies_;
+    }
+
+private:
+    mutable platform::Mutex mutex_;
+    std::vector<Dictionary> replies_ ZOR_GUARDED_BY(mutex_);
+};
+
+std::shared_ptr<const platform::IdentityGrant> grant(std::optional<std::string> identifier,
+                                                     std::optional<Dictionary> entitlements) {
+    return std::make_shared<platform::IdentityGrant>(
+        platform::IdentityGrant{.identifier = std::move(identifier), .entitlements = std::move(entitlements)});
+}
+
+const Dictionary noPowers{};
+const Dictionary everything{{std::string(powers::allowed), true}};
+
+class Dispatch : public testing::Test {
+protected:
+    Dispatch() {
+        world.load();
+        as(grant("com.example", noPowers));
+        world.log.take();
+    }
+    void as(std::shared_ptr<const platform::IdentityGrant> granted, std::uint32_t userId = mobile) {
+        connection.peer_.identity = {.pid = peerPid, .effectiveUserId = userId, .grant = std::move(granted)};
+    }
+    void handle(platform::ServiceEvent event) {
+        world.services().dispatcher().ZORProcessIpsiEvent(connection, event);
+    }
+    /// The one reply; the connection must have stayed open.
+    Dictionary request(const Dictionary& message) {
+        const auto channel = std::make_shared<FakeReply>();
+        handle({.kind = Kind::message, .request = message, .reply = channel});
+        for (int i = 0; i < 5000 && channel->replies().empty() && connection.cancelled == 0; ++i)
+            std::this_thread::sleep_for(std::chrono::milliseconds(1));
+        world.drainDeathRow();
+        EXPECT_EQ(connection.cancelled, 0);
+        EXPECT_EQ(channel->replies().size(), 1U);
+        return channel->replies().empty() ? Dictionary() : channel->replies()[0];
+    }
+    /// Expects the refusal of a message: the connection ends, nothing is answered.
+    void expectRefused(const Dictionary& message, const std::vector<LogLine>& lines) {
+        const auto channel = std::make_shared<FakeReply>();
+        connection.cancelled = 0;
+        world.log.take();
+        handle({.kind = Kind::message, .request = message, .reply = channel});
+        EXPECT_EQ(connection.cancelled, 1);
+        EXPECT_TRUE(channel->replies().empty());
+        EXPECT_EQ(world.log.take(), lines);
+        connection.cancelled = 0;
+    }
+    static std::uint64_t errorOf(const Dictionary& reply) { return reply.unsignedInteger("ReplyError").value_or(0); }
+    static LogLine missing(const std::string& identifier, std::string_view entitlement) {
+        return {3, admission,
+                "connection attempt from pid 4711 (" + identifier + ") missing required entitlement: " +
+                    std::string(entitlement)};
+    }
+
+    World world;
+    FakeConnection connection;
+};
+
+// Goal: each way of being refused has its lines and ends the connection without a reply. Method: a table.
+TEST_F(Dispatch, Refusals) {
+    struct Row {
+        const char* name;
+        std::shared_ptr<const platform::IdentityGrant> granted;
+        Dictionary message;
+        std::vector<LogLine> lines;
+    };
+    const LogLine noEntry{3, admission, "Failed to copy signing ID for pid 4711 : no registry entry matches it"};
+    const LogLine noIdentifier{3, admission, "Failed to copy signing ID for pid 4711 : its registry entry has none"};
+    const LogLine noWipe{3, admission, "No entitled containers to wipe"};
+    const Dictionary list{{"Command", 1}};
+    const Dictionary wipe{{"Command", 11}};
+    const auto with = [](std::string_view key, plist::Value value) {
+        return grant("com.example", Dictionary{{std::string(key), std::move(value)}});
+    };
+    const Row rows[] = {
+        {"command 23", grant("a", everything), {{"Command", 23}}, {{3, handler, "Invalid command index: 23"}}},
+        {"command 2^32", grant("a", everything), {{"Command", std::uint64_t{1} << 32}},
+         {{3, handler, "Invalid command index: 4294967296"}}},
+        {"the largest command", nullptr, {{"Command", ~std::uint64_t{0}}}, {{3, handler, "Invalid command index: -1"}}},
+        {"unknown, needs none", nullptr, {}, {noEntry}},
+        {"unknown, needs more", nullptr, list, {noEntry, missing("(null)", powers::allowed)}},
+        {"no entitlements, needs none", grant("com.example", {}), {}, {}},
+        {"no entitlements, needs more", grant("com.example", {}), list, {missing("com.example", powers::allowed)}},
+        {"no identifier", grant({}, noPowers), list, {noIdentifier, missing("(null)", powers::allowed)}},
+        {"allowed is false", with(powers::allowed, false), list, {missing("com.example", powers::allowed)}},
+        {"allowed is a number", with(powers::allowed, 1), list, {missing("com.example", powers::allowed)}},
+        {"only another power", with(powers::otherIdLookup, true), list, {missing("com.example", powers::allowed)}},
+        {"wipe is no array", with(powers::wipeContainer, true), wipe,
+         {noWipe, missing("com.example", powers::wipeContainer)}},
+        {"wipe is missing", grant("com.example", noPowers), wipe,
+         {noWipe, missing("com.example", powers::wipeContainer)}},
+        {"wipe is no admission elsewhere", with(powers::wipeContainer, Array{"x"}), list,
+         {missing("com.example", powers::allowed)}},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.name);
+        as(row.granted);
+        expectRefused(row.message, row.lines);
+    }
+    EXPECT_EQ(world.services().dispatcher().counts().refused, std::size(rows));
+    EXPECT_EQ(world.services().dispatcher().counts().served, 0U);
+}
+
+// Goal: exactly the entitled are admitted to each of the 23 commands, and each that is admitted gets exactly one reply with
+// "ReplyError". Method: all commands against all kinds of peer.
+TEST_F(Dispatch, EveryCommandAdmitsByItsEntitlement) {
+    const std::set<std::uint64_t> unguarded = {0, 13, 15, 16, 17};
+    enum class Admits { none, basic, basicAndWipe, all };
+    struct Row {
+        std::optional<Dictionary> entitlements;
+        Admits admits;
+    };
+    const std::string wipeKey(powers::wipeContainer);
+    const Row rows[] = {
+        {std::nullopt, Admits::none},
+        {noPowers, Admits::basic},
+        {Dictionary{{std::string(powers::otherIdLookup), true}}, Admits::basic},
+        {Dictionary{{wipeKey, "x"}}, Admits::basic},
+        {Dictionary{{wipeKey, Array{}}}, Admits::basicAndWipe},
+        {everything, Admits::all},
+        {Dictionary{{std::string(powers::allowed), true}, {wipeKey, true}}, Admits::all},
+    };
+    ASSERT_EQ(commandTable.size(), 23U);
+    for (std::uint64_t command = 0; command < commandTable.size(); ++command) {
+        EXPECT_EQ(commandTable[command].replyFlag == ReplyFlag::handlerReplies, command == 4 || command == 19);
+        for (const Row& row : rows) {
+            SCOPED_TRACE("command " + std::to_string(command) + " as " + std::to_string(&row - rows));
+            as(grant("com.example", row.entitlements));
+            const bool admitted = row.admits == Admits::all ||
+                                  (unguarded.contains(command) && row.admits != Admits::none) ||
+                                  (command == 11 && row.admits == Admits::basicAndWipe);
+            const Dictionary message{{"Command", command}};
+            if (admitted) {
+                const Dictionary reply = request(message);
+                EXPECT_NE(errorOf(reply), 0U);
+                const ZORCommandHandler run = commandTable[command].handler;
+                if (run == commands::notServedYet || run == commands::notServedYetDeferred) {
+                    EXPECT_NE(errorOf(reply), ipc::replySuccess);
+                }
+            } else {
+                const auto channel = std::make_shared<FakeReply>();
+                handle({.kind = Kind::message, .request = message, .reply = channel});
+                EXPECT_EQ(std::exchange(connection.cancelled, 0), 1);
+                EXPECT_TRUE(channel->replies().empty());
+            }
+        }
+    }
+}
+
+TEST_F(Dispatch, EventsThatAreNoMessages) {
+    handle({.kind = Kind::invalid, .request = {}, .reply = nullptr});
+    EXPECT_EQ(connection.cancelled, 0);
+    EXPECT_TRUE(world.log.take().empty());
+    const std::vector<LogLine> noContext = {{3, handler, "Dictionary does not have reply context"}};
+    for (const Kind kind : {Kind::other, Kind::message}) {
+        handle({.kind = kind, .request = {}, .reply = nullptr});
+        EXPECT_EQ(std::exchange(connection.cancelled, 0), 1);
+        EXPECT_EQ(world.log.take(), noContext);
+    }
+    // Admission comes first.
+    as(nullptr);
+    handle({.kind = Kind::other, .request = {}, .reply = nullptr});
+    EXPECT_EQ(connection.cancelled, 1);
+    EXPECT_EQ(world.log.take().size(), 1U);
+    EXPECT_FALSE(world.exists(mobileContainers));
+}
+
+// Goal: the reply to the emptying of death row comes once, when the pass has run, with its code. Method: hold the queue.
+TEST_F(Dispatch, TheDeferredReplyComesOnceAfterThePass) {
+    as(grant("com.example", everything));
+    world.makeDirectories(std::string(cachesPath) + "/Dead/temp.abcdef/old");
+    platform::WorkQueue& queue = world.linux().roles().deathRowQueue;
+    queue.suspend();
+    const auto channel = std::make_shared<FakeReply>();
+    handle({.kind = Kind::message, .request = {{"Command", 4}}, .reply = channel});
+    EXPECT_TRUE(channel->replies().empty());
+    EXPECT_TRUE(world.exists(std::string(cachesPath) + "/Dead/temp.abcdef/old"));
+    queue.resume();
+    world.drainDeathRow();
+    EXPECT_EQ(channel->replies(), (std::vector<Dictionary>{{{"ReplyError", std::uint64_t{1}}}}));
+    EXPECT_TRUE(world.names(std::string(cachesPath) + "/Dead").empty());
+    EXPECT_EQ(connection.cancelled, 0);
+}
+
+// Goal: command 0 from keys to keys. Method: requests in a row, each with the reply's whole content or its error.
+TEST_F(Dispatch, CreatesAndLooksUp) {
+    // Without "Command" it is command 0, and so it is with one that is no unsigned number.
+    EXPECT_EQ(errorOf(request({{"ContainerClass", 2}, {"UserID", 1}})), 21U);
+    EXPECT_EQ(errorOf(request({{"Command", "4"}, {"ContainerClass", 2}, {"UserID", 1}})), 21U);
+    EXPECT_EQ(request({{"ContainerClass", 2}, {"UserID", 1}}), (Dictionary{{"ReplyError", std::uint64_t{21}}}));
+
+    const Dictionary made = request({{"ContainerClass", 2}, {"UserID", 501}, {"CreateIfNecessary", true}});
+    EXPECT_EQ(errorOf(made), 1U);
+    EXPECT_EQ(made.size(), 5U);
+    EXPECT_EQ(*made.string("ReplyIdentifier"), "com.example"); // its own by default
+    EXPECT_TRUE(made.find("ReplyExisted") && !made.isTrue("ReplyExisted"));
+    ASSERT_TRUE(made.data("ReplyUUID") && made.string("ReplyPath"));
+    EXPECT_EQ(made.data("ReplyUUID")->size(), 16U);
+    EXPECT_TRUE(made.string("ReplyPath")->starts_with(world.path(mobileContainers) + "/Data/Application/"));
+    // Only the low 32 bits of the user count.
+    const Dictionary found = request({{"ContainerClass", 2},
+                                      {"UserID", (std::uint64_t{7} << 32) + 501},
+                                      {"Identifier", "com.example"},
+                                      {"CreateIfNecessary", true}});
+    EXPECT_TRUE(found.isTrue("ReplyExisted"));
+    EXPECT_EQ(*found.data("ReplyUUID"), *made.data("ReplyUUID"));
+
+    struct Row {
+        std::optional<std::string> own;
+        std::uint32_t uid;
+        Dictionary message;
+        std::uint64_t error;
+    };
+    const plist::Value create = true;
+    const Row rows[] = {
+        {"com.example", mobile, {{"ContainerClass", 2}, {"UserID", 502}}, 38},
+        {"com.example", mobile, {{"ContainerClass", 1}, {"UserID", 1}}, 38},
+        {"com.example", mobile, {{"ContainerClass", 0}, {"UserID", 1}}, 11},
+        {"com.example", mobile, {{"ContainerClass", 2}}, 38},
+        {std::nullopt, mobile, {{"ContainerClass", 2}, {"UserID", 1}, {"CreateIfNecessary", create}}, 11},
+        {"com.example", mobile, {{"ContainerClass", 2}, {"UserID", 1}, {"CreateIfNecessary", 1}, {"Identifier", "b"}}, 21},
+        {"com.example", mobile, {{"ContainerClass", 12}, {"UserID", 499}, {"CreateIfNecessary", create}}, 55},
+        {"com.example", 0, {{"ContainerClass", 2}, {"UserID", 1}, {"Identifier", 5}}, 1}, // no string: its own
+        {"com.example", 0, {{"ContainerClass", 2}, {"UserID", -501}}, 38},
+        {"com.example", 0, {{"ContainerClass", -2}, {"UserID", 1}}, 11},
+    };
+    for (const Row& row : rows) {
+        as(grant(row.own, noPowers), row.uid);
+        const Dictionary reply = request(row.message);
+        EXPECT_EQ(errorOf(reply), row.error) << &row - rows;
+        EXPECT_EQ(reply.size(), row.error == 1 ? 5U : 1U) << &row - rows;
+    }
+    as(grant("com.example", Dictionary{{std::string(powers::otherIdLookup), true}}));
+    EXPECT_EQ(errorOf(request({{"ContainerClass", 12}, {"UserID", 499}, {"CreateIfNecessary", true}})), 1U);
+}
+
+TEST_F(Dispatch, Lists) {
+    as(grant("com.example", everything), 0);
+    const Dictionary list{{"Command", 1}, {"ContainerClass", 2}, {"UserID", 1}};
+    EXPECT_EQ(request(list), (Dictionary{{"ReplyError", std::uint64_t{1}},
+                                         {"ReplyIdsArray", Array{}},
+                                         {"ReplyUUIDsArray", Array{}}}));
+    std::map<std::string, plist::Data> uuids;
+    for (const char* identifier : {"a", "b", "c"})
+        uuids[identifier] = *request({{"ContainerClass", 2},
+                                      {"UserID", 1},
+                                      {"Identifier", identifier},
+                                      {"CreateIfNecessary", true}})
+                                 .data("ReplyUUID");
+    const Dictionary reply = request(list);
+    ASSERT_TRUE(reply.array("ReplyIdsArray") && reply.array("ReplyUUIDsArray"));
+    ASSERT_EQ(reply.array("ReplyIdsArray")->size(), 3U);
+    std::map<std::string, plist::Data> listed;
+    for (std::size_t i = 0; i < 3; ++i)
+        listed[*reply.array("ReplyIdsArray")->at(i).asString()] = *reply.array("ReplyUUIDsArray")->at(i).asData();
+    EXPECT_EQ(listed, uuids);
+    EXPECT_EQ(request({{"Command", 1}, {"ContainerClass", 2}, {"UserID", 1}, {"Transient", true}})
+                  .array("ReplyIdsArray")
+                  ->size(),
+              0U);
+    EXPECT_EQ(request({{"Command", 1}, {"ContainerClass", 14}, {"UserID", 1}}),
+              (Dictionary{{"ReplyError", std::uint64_t{11}}}));
+    EXPECT_EQ(request({{"Command", 1}, {"ContainerClass", 2}, {"UserID", 33}}),
+              (Dictionary{{"ReplyError", std::uint64_t{38}}}));
+}
+
+// Goal: a client that is refused over and over cannot fill the log, and another user's lines are not lost for it. Method:
+// more refusals than a second's share.
+TEST_F(Dispatch, RefusalsAreLimitedForEachUser) {
+    constexpr std::size_t refusals = 2000;
+    for (std::size_t i = 0; i < refusals; ++i)
+        handle({.kind = Kind::message, .request = {{"Command", 99}}, .reply = nullptr});
+    EXPECT_LT(world.log.take(3, handler).size(), refusals);
+    as(grant("com.example", noPowers), second);
+    handle({.kind = Kind::message, .request = {{"Command", 99}}, .reply = nullptr});
+    EXPECT_EQ(world.log.take(3, handler).size(), 1U);
+}
+
+} // namespace
+} // namespace zor::test
