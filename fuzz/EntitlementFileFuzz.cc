@@ -1,14 +1,14 @@
 // SPDX-License-Identifier: Apache-2.0
-// Any bytes as the entitlement file of a daemon: it starts, answers every question about every key, and takes a change whose
-// result the next daemon reads. Runs over one root in memory that lives as long as the fuzzer.
+// Any bytes as the entitlement file of a daemon: it starts, answers every question about every key, and takes a change
+// whose result the next daemon reads. Runs over one root in memory that lives as long as the fuzzer.
 #include "entitlements/ZOREntitlementMapping.h"
+#include "fs/AtomicFile.h"
+#include "fs/DictionaryFile.h"
 #include "platform/linux/FileDeviceLockState.h"
 #include "platform/linux/LinuxDisk.h"
 #include "platform/linux/LinuxPasswordDatabase.h"
 #include "platform/linux/SystemRoot.h"
 #include "platform/linux/XattrProtectionClass.h"
-#include "fs/AtomicFile.h"
-#include "fs/DictionaryFile.h"
 #include "store/Names.h"
 
 #include <algorithm>

@@ -60,8 +60,8 @@ TEST(Error, IsLoggedOnceWhereItIsMade) {
     EXPECT_FALSE(cause.is(static_cast<ErrorCode>(2)));
 }
 
-// Goal: which levels are written. Method: every handle state against every level; the arguments of an unwritten line are
-// not evaluated.
+// Goal: which levels are written. Method: every handle state against every level; the arguments of an unwritten line
+// are not evaluated.
 TEST(Log, LevelGate) {
     struct Row {
         int handleLevel; // 0: no handle
@@ -85,8 +85,8 @@ TEST(Log, LevelGate) {
     }
 }
 
-// Goal: only level 3 of the thread that serves the client counts against its user. Method: a gate that refuses all, scopes
-// inside each other, another thread.
+// Goal: only level 3 of the thread that serves the client counts against its user. Method: a gate that refuses all,
+// scopes inside each other, another thread.
 TEST(Log, ProvokedLinesAskTheGate) {
     support::RecordingLog sink(logLevelDebug);
     Log log(sink);
@@ -138,8 +138,8 @@ public:
     void record(std::string_view) override { ADD_FAILURE() << "a crash was recorded"; }
 };
 
-// Goal: an exception becomes error 40 under the operation's name, anything that is none passes through. Method: the three
-// kinds of throw.
+// Goal: an exception becomes error 40 under the operation's name, anything that is none passes through. Method: the
+// three kinds of throw.
 TEST(ExceptionBoundary, TurnsExceptionsIntoError40) {
     support::RecordingLog sink(logLevelNotice);
     const Log log(sink);
@@ -167,8 +167,8 @@ TEST(ExceptionBoundary, TurnsExceptionsIntoError40) {
     EXPECT_THROW((void)boundary.run({"lookup", 4}, []() -> Result<int> { throw NoException(); }), NoException);
 }
 
-// Goal: on an internal build the process dies with the first report in its file. Method: a child whose threads all fail at
-// once; how it ended and the one file it left.
+// Goal: on an internal build the process dies with the first report in its file. Method: a child whose threads all fail
+// at once; how it ended and the one file it left.
 TEST(ExceptionBoundary, AnInternalBuildAbortsWithTheFirstReport) {
     const support::TemporaryDirectory directory;
     std::string logs = directory.path();
@@ -177,7 +177,7 @@ TEST(ExceptionBoundary, AnInternalBuildAbortsWithTheFirstReport) {
     const pid_t child = ::fork();
     ASSERT_GE(child, 0);
     if (child == 0) {
-        const struct rlimit noCore {};
+        const struct rlimit noCore{};
         ::setrlimit(RLIMIT_CORE, &noCore);
         auto root = platform::SystemRoot::open(directory.path());
         platform::LinuxDisk disk(platform::Syncs::off);

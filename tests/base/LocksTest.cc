@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// The identifier locks: who waits for whom, in which order several are taken, what misuse does; a load over all modes in
-// which plain variables are guarded by nothing else, for ThreadSanitizer to judge.
+// The identifier locks: who waits for whom, in which order several are taken, what misuse does; a load over all modes
+// in which plain variables are guarded by nothing else, for ThreadSanitizer to judge.
 #include "daemon/base/ZORLocks.h"
 #include "support/RecordingLog.h"
 
@@ -77,8 +77,8 @@ TEST_F(Locks, SeveralAreTakenOnceEachAscendingAndReleasedDescending) {
                            }));
 }
 
-// Goal: every pair of lock requests excludes or admits as it should. Method: hold the first, ask for the second in another
-// thread; one that has to wait must end after the release, and not before.
+// Goal: every pair of lock requests excludes or admits as it should. Method: hold the first, ask for the second in
+// another thread; one that has to wait must end after the release, and not before.
 TEST_F(Locks, WhoWaitsForWhom) {
     struct Request {
         const char* name;
@@ -104,10 +104,9 @@ TEST_F(Locks, WhoWaitsForWhom) {
     constexpr bool waits = true;
     constexpr bool goes = false;
     const bool expected[6][6] = {
-        {goes, waits, goes, goes, goes, waits},  // A is read
+        {goes, waits, goes, goes, goes, waits},   // A is read
         {waits, waits, goes, goes, waits, waits}, // A is written
-        {goes, goes, goes, waits, goes, waits},
-        {goes, goes, waits, waits, waits, waits},
+        {goes, goes, goes, waits, goes, waits},     {goes, goes, waits, waits, waits, waits},
         {goes, waits, goes, waits, goes, waits}, // all is read
         {waits, waits, waits, waits, waits, waits},
     };
@@ -158,7 +157,8 @@ TEST_F(Locks, AnAdmittedIdentifierComesBeforeAWriterOfAll) {
     EXPECT_EQ(locks.identifiersInUse(), 0U);
 }
 
-// Goal: misuse is said and leaves every counter as it was. Method: after it the locks still exclude and still become free.
+// Goal: misuse is said and leaves every counter as it was. Method: after it the locks still exclude and still become
+// free.
 TEST_F(Locks, MisuseChangesNothing) {
     locks.unlock_identifier("A");
     locks.unlock_all_identifiers();
@@ -190,8 +190,8 @@ TEST_F(Locks, AScopeReleasesOnce) {
     EXPECT_TRUE(sink.take(3, "unlock_all_identifiers").empty());
 }
 
-// Goal: exclusion holds under load, nothing deadlocks, no signal is lost. Method: pairs of plain numbers that every holder
-// changes or compares.
+// Goal: exclusion holds under load, nothing deadlocks, no signal is lost. Method: pairs of plain numbers that every
+// holder changes or compares.
 TEST_F(Locks, LoadOverEveryMode) {
     constexpr int threadCount = 6;
     constexpr int rounds = 1500;

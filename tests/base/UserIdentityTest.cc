@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// Whose containers a request may act on, as tables over every class; the lookup of the mobile user by many threads at once.
+// Whose containers a request may act on, as tables over every class; the lookup of the mobile user by many threads at
+// once.
 #include "daemon/base/UserIdentity.h"
 #include "support/RecordingLog.h"
 
@@ -60,14 +61,37 @@ TEST(UserIdentity, RequestsResolveByClassAndClient) {
     };
     const std::vector<Row> rows = {
         // Bundle and system classes: the owner, whoever asks.
-        {33, 1, 0, 33}, {33, 8, 501, 33}, {1, 1, 0, {}}, {1, 1, 501, {}}, {501, 5, 501, {}}, {501, 3, 0, {}},
-        {499, 12, 0, 499}, {499, 13, 501, 499}, {1, 12, 0, {}}, {501, 13, 501, {}}, {505, 12, 0, {}},
+        {33, 1, 0, 33},
+        {33, 8, 501, 33},
+        {1, 1, 0, {}},
+        {1, 1, 501, {}},
+        {501, 5, 501, {}},
+        {501, 3, 0, {}},
+        {499, 12, 0, 499},
+        {499, 13, 501, 499},
+        {1, 12, 0, {}},
+        {501, 13, 501, {}},
+        {505, 12, 0, {}},
         // System clients: 1 is the mobile user whatever the class, others by the table of owners.
-        {1, 2, 0, 507}, {1, 2, 500, 507}, {1, 0, 0, 507}, {1, 14, 0, 507}, {505, 2, 0, 505}, {510, 11, 499, 510},
-        {511, 2, 0, {}}, {500, 2, 0, {}}, {0, 2, 0, {}}, {501, 14, 0, {}},
+        {1, 2, 0, 507},
+        {1, 2, 500, 507},
+        {1, 0, 0, 507},
+        {1, 14, 0, 507},
+        {505, 2, 0, 505},
+        {510, 11, 499, 510},
+        {511, 2, 0, {}},
+        {500, 2, 0, {}},
+        {0, 2, 0, {}},
+        {501, 14, 0, {}},
         // Mobile clients act as themselves.
-        {1, 2, 501, 501}, {501, 2, 501, 501}, {502, 2, 501, {}}, {0, 2, 501, {}}, {1, 0, 501, 501}, {1, 99, 777, 777},
-        {777, 2, 777, 777}, {507, 7, 501, {}},
+        {1, 2, 501, 501},
+        {501, 2, 501, 501},
+        {502, 2, 501, {}},
+        {0, 2, 501, {}},
+        {1, 0, 501, 501},
+        {1, 99, 777, 777},
+        {777, 2, 777, 777},
+        {507, 7, 501, {}},
     };
     for (const Row& row : rows) {
         support::RecordingLog sink(logLevelNotice);
@@ -91,8 +115,8 @@ TEST(UserIdentity, RequestsResolveByClassAndClient) {
     }
 }
 
-// Goal: one lookup for ever, and all first callers get its answer. Method: many threads ask at once, with and without the
-// account.
+// Goal: one lookup for ever, and all first callers get its answer. Method: many threads ask at once, with and without
+// the account.
 TEST(UserIdentity, TheMobileUserIsLookedUpOnce) {
     for (const auto& account : {std::optional<std::uint32_t>(501), std::optional<std::uint32_t>()}) {
         support::RecordingLog sink(logLevelNotice);
@@ -107,10 +131,8 @@ TEST(UserIdentity, TheMobileUserIsLookedUpOnce) {
             thread.join();
         EXPECT_EQ(agreeing, 8);
         EXPECT_EQ(passwords.lookups, 1);
-        const char* message =
-            account ? "Current mobile user ID is 501" : "Failed to get mobile uid. This is bad";
-        EXPECT_EQ(sink.take(),
-                  (std::vector<support::LogLine>{{3, "__getCurrentMobileUserId_block_invoke", message}}));
+        const char* message = account ? "Current mobile user ID is 501" : "Failed to get mobile uid. This is bad";
+        EXPECT_EQ(sink.take(), (std::vector<support::LogLine>{{3, "__getCurrentMobileUserId_block_invoke", message}}));
     }
 }
 

@@ -153,10 +153,10 @@ TEST_F(FileManager, Existence) {
         bool doesNotExist;
         const char* said;
     };
-    for (const Row& row : {Row{"d", true, false, nullptr}, Row{"f", true, false, nullptr},
-                           Row{"dangling", true, false, nullptr}, Row{"missing", false, true, nullptr},
-                           Row{"missing/below", false, true, nullptr}, Row{"f/below", false, false, "Not a directory"},
-                           Row{"toDirectory/f", false, false, "Not a directory"}}) {
+    for (const Row& row :
+         {Row{"d", true, false, nullptr}, Row{"f", true, false, nullptr}, Row{"dangling", true, false, nullptr},
+          Row{"missing", false, true, nullptr}, Row{"missing/below", false, true, nullptr},
+          Row{"f/below", false, false, "Not a directory"}, Row{"toDirectory/f", false, false, "Not a directory"}}) {
         EXPECT_EQ(manager().itemExistsAtURL(url(row.name)), row.exists) << row.name;
         EXPECT_EQ(manager().itemDoesNotExistAtURL(url(row.name)), row.doesNotExist) << row.name;
         std::vector<LogLine> expected;

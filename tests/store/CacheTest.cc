@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// The container cache: built once, in the directory's order, by one thread or two; what it answers when the disk is not as
-// it remembers; readers and writers at once.
+// The container cache: built once, in the directory's order, by one thread or two; what it answers when the disk is not
+// as it remembers; readers and writers at once.
 #include "world/World.h"
 
 #include <atomic>
@@ -39,8 +39,7 @@ protected:
     ZORContainerCache& cache() { return world.services().cache(); }
     /// A container of the identifier, in a directory and with an internal UUID made of the numbers.
     void put(const std::string& directory, int name, const std::string& identifier, int uuid) const {
-        world.putContainer(directory + "/" + uuidNumber(name),
-                           metadataOf(2, mobile, identifier, uuidNumber(uuid)));
+        world.putContainer(directory + "/" + uuidNumber(name), metadataOf(2, mobile, identifier, uuidNumber(uuid)));
     }
     Result<ZORContainerCache::Record> find(const std::string& identifier, bool transient = false) {
         return cache().containerForUser(mobile, application, &identifier, transient);
@@ -76,8 +75,8 @@ TEST_F(Cache, IsBuiltOnceAndAsksOnlyForTheFileAfterwards) {
     EXPECT_TRUE(find("b"));
 }
 
-// Goal: of two containers with one identifier the later listed counts, whoever reads them. Method: a small directory (one
-// thread) and a large one (two), compared with the directory's own order.
+// Goal: of two containers with one identifier the later listed counts, whoever reads them. Method: a small directory
+// (one thread) and a large one (two), compared with the directory's own order.
 TEST_F(Cache, TheLaterListedCounts) {
     for (const int count : {8, 1000}) {
         world.services().cache().dropAll();
@@ -103,8 +102,8 @@ TEST_F(Cache, TheLaterListedCounts) {
     }
 }
 
-// Goal: what is not valid stays out and is said, in the directory's order, however many threads read. Method: every tenth
-// of many entries is bad.
+// Goal: what is not valid stays out and is said, in the directory's order, however many threads read. Method: every
+// tenth of many entries is bad.
 TEST_F(Cache, InvalidEntriesStayOut) {
     constexpr int count = 400;
     for (int i = 0; i < count; ++i) {
@@ -181,8 +180,7 @@ TEST_F(Cache, WrongInputs) {
         {errorOf(cache().containerForUser(mobile, asClass(0), &identifier, false)), invalid,
          "Invalid Content Class: 0"},
         {errorOf(cache().containerForUser(mobile, asClass(14), nullptr, false)), invalid, "Invalid Content Class: 14"},
-        {errorOf(cache().containerForUser(mobile, application, nullptr, false)), invalid,
-         "Invalid identifier: (null)"},
+        {errorOf(cache().containerForUser(mobile, application, nullptr, false)), invalid, "Invalid identifier: (null)"},
         {errorOf(cache().allContainersForUser(mobile, asClass(14), false)), invalid, "Invalid Content Class: 14"},
         {errorOf(cache().removeContainerForUser(mobile, asClass(0), &identifier, false)), invalid,
          "Invalid Content Class: 0"},
@@ -249,8 +247,8 @@ TEST_F(Cache, AddingBuildsFirstAndReplaces) {
     const auto record = std::make_shared<ZORMetadata>(mobile, *UUID::parse(uuidNumber(13)), application, identifier,
                                                       nullptr, ContainerPlace());
     put(applications, 3, "elsewhere", 13);
-    ASSERT_TRUE(cache().addContainerMetadata(record, mobile, ContainerPlace(world.url(applications + "/" + uuidNumber(3))),
-                                             false));
+    ASSERT_TRUE(cache().addContainerMetadata(record, mobile,
+                                             ContainerPlace(world.url(applications + "/" + uuidNumber(3))), false));
     EXPECT_EQ(find("a")->get(), record.get());
     EXPECT_EQ(record->url(), world.url(applications + "/" + uuidNumber(3)));
     EXPECT_TRUE(find("b"));
@@ -258,8 +256,7 @@ TEST_F(Cache, AddingBuildsFirstAndReplaces) {
     ASSERT_TRUE(cache().removeContainerForUser(mobile, application, &identifier, false));
     EXPECT_TRUE(find("a").error().is(ErrorCode::notFound));
     const auto said = world.log.take();
-    EXPECT_EQ(linesWith(said, "Added"),
-              (std::vector<std::string>{"Cache: Data/Application: Added Identifier: a"}));
+    EXPECT_EQ(linesWith(said, "Added"), (std::vector<std::string>{"Cache: Data/Application: Added Identifier: a"}));
     EXPECT_EQ(linesWith(said, "Removed").size(), 2U);
     // A record that lost its place is said so: as an answer, and as one left out of a listing.
     (*find("b"))->setPlace({});
@@ -322,8 +319,8 @@ TEST_F(Cache, ManyThreads) {
         threads.emplace_back([&, t] {
             const std::string own = "own" + std::to_string(t);
             for (int round = 0; round < 30; ++round) {
-                const auto record = std::make_shared<ZORMetadata>(mobile, UUID::random(), application, own, nullptr,
-                                                                  ContainerPlace());
+                const auto record =
+                    std::make_shared<ZORMetadata>(mobile, UUID::random(), application, own, nullptr, ContainerPlace());
                 wrong += !cache().addContainerMetadata(
                     record, mobile, ContainerPlace(world.url(applications + "/" + uuidNumber(t))), false);
                 const auto found = find(own);

@@ -52,8 +52,9 @@ protected:
     }
 };
 
-// Goal: every class gets its tree, modes and owners, a directory name that is not its internal UUID, and a metadata file of
-// the daemon's own; a new daemon finds the same container. Method: all classes, live and transient, against a table.
+// Goal: every class gets its tree, modes and owners, a directory name that is not its internal UUID, and a metadata
+// file of the daemon's own; a new daemon finds the same container. Method: all classes, live and transient, against a
+// table.
 TEST_F(Create, EveryClassGetsItsTree) {
     using Names = std::vector<std::string>;
     const Names data = {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp"};
@@ -82,7 +83,8 @@ TEST_F(Create, EveryClassGetsItsTree) {
             const Names& expected = bundle ? Names() : number == 7 || number == 13 ? group : data;
             std::set<std::string> top = {names::metadataFile};
             for (const std::string& subdirectory : expected) {
-                EXPECT_EQ(world.item(path + "/" + subdirectory), directoryOf(system ? 0 : mobile, system ? 0777 : 0755));
+                EXPECT_EQ(world.item(path + "/" + subdirectory),
+                          directoryOf(system ? 0 : mobile, system ? 0777 : 0755));
                 top.insert(subdirectory.substr(0, subdirectory.find('/')));
             }
             const auto there = world.names(path);
@@ -93,8 +95,8 @@ TEST_F(Create, EveryClassGetsItsTree) {
             const auto content =
                 plist::readPropertyList({reinterpret_cast<const std::uint8_t*>(bytes.data()), bytes.size()});
             ASSERT_TRUE(content);
-            EXPECT_EQ(*content, plist::Value(metadataOf(number, ownerOf(containerClass), "com.example",
-                                                        found->uuid.string())));
+            EXPECT_EQ(*content,
+                      plist::Value(metadataOf(number, ownerOf(containerClass), "com.example", found->uuid.string())));
             EXPECT_TRUE(world.names(staging).empty());
             EXPECT_EQ(listed(containerClass, transient), (std::set<std::string>{"com.example"}));
             if (transient)
@@ -125,8 +127,8 @@ TEST_F(Create, WellKnownContainersHaveFixedNames) {
     EXPECT_TRUE(UUID::parse(FileURL::directory(ask("com.veltra.settingsd")->path).lastPathComponent()));
 }
 
-// Goal: what cannot be acted on is refused with its words, before any lock is taken. Method: a table; the lock's own lines
-// would show.
+// Goal: what cannot be acted on is refused with its words, before any lock is taken. Method: a table; the lock's own
+// lines would show.
 TEST_F(Create, RefusesBeforeAnyLock) {
     world.load();
     world.log.setLevel(logLevelDebug);
@@ -176,8 +178,10 @@ TEST_F(Create, RefusesBeforeAnyLock) {
         EXPECT_TRUE(hasLine(said, 3, "containersForUser",
                             "Can't act on an invalid container-userId: 501, class: " + std::to_string(number)));
     }
-    EXPECT_TRUE(world.daemonsClient().containersForUser(mobile, ContainerClass::bundleFramework, false).error().is(
-        ErrorCode::cacheNotRebuilt));
+    EXPECT_TRUE(world.daemonsClient()
+                    .containersForUser(mobile, ContainerClass::bundleFramework, false)
+                    .error()
+                    .is(ErrorCode::cacheNotRebuilt));
     EXPECT_FALSE(world.exists(staging));
     // The entitlement admits a client to its own system container.
     ASSERT_TRUE(world.services().entitlements()._setEntitlementDictionaryValues(
@@ -208,8 +212,8 @@ TEST_F(Create, AnInconsistentContainerIsNotMadeAgain) {
     EXPECT_TRUE(listed().empty());
 }
 
-// Goal: a transient container is never found again, and none stands in the way of the next. Method: create, create again,
-// ask without creation, ask once more; a removal that fails is error 5 and changes nothing.
+// Goal: a transient container is never found again, and none stands in the way of the next. Method: create, create
+// again, ask without creation, ask once more; a removal that fails is error 5 and changes nothing.
 TEST_F(Create, TransientContainersAreThrownAwayWhenAskedForAgain) {
     constexpr ZORClientConnection::CreateOrLookupOptions make{.createIfNecessary = true, .transient = true};
     constexpr ZORClientConnection::CreateOrLookupOptions look{.transient = true};
@@ -236,9 +240,8 @@ TEST_F(Create, TransientContainersAreThrownAwayWhenAskedForAgain) {
     EXPECT_TRUE(listed(application, true).empty());
     // One whose re-creation fails is gone as well: the next request finds nothing and makes it.
     ASSERT_TRUE(ask("com.example", application, make));
-    world.disk().arm({.error = ENOSPC, .filter = [](const DiskCallInfo& call) {
-                          return call.call == DiskCall::createFile;
-                      }});
+    world.disk().arm(
+        {.error = ENOSPC, .filter = [](const DiskCallInfo& call) { return call.call == DiskCall::createFile; }});
     EXPECT_TRUE(ask("com.example", application, make).error().is(ErrorCode::propertyListNotWritten));
     world.disk().disarm();
     EXPECT_TRUE(ask("com.example", application, look).error().is(ErrorCode::notFound));
@@ -247,8 +250,8 @@ TEST_F(Create, TransientContainersAreThrownAwayWhenAskedForAgain) {
     EXPECT_TRUE(world.names(dead).empty());
 }
 
-// Goal: each step that fails has its code and words, leaves nothing in staging and nothing under a final name, and the next
-// request succeeds. Method: one failing call a row.
+// Goal: each step that fails has its code and words, leaves nothing in staging and nothing under a final name, and the
+// next request succeeds. Method: one failing call a row.
 TEST_F(Create, AFailedStepLeavesNothing) {
     world.load();
     ASSERT_TRUE(listed().empty()); // the caches and directories are there
@@ -316,8 +319,8 @@ TEST_F(Create, AFailedStepLeavesNothing) {
     EXPECT_TRUE(world.names(dead).empty());
 }
 
-// Goal: an exception in the middle is error 40 and cleans up; what is no exception cleans up and goes on. Method: the disk
-// throws at the last step before the move.
+// Goal: an exception in the middle is error 40 and cleans up; what is no exception cleans up and goes on. Method: the
+// disk throws at the last step before the move.
 TEST_F(Create, ExceptionsCleanUp) {
     struct NoException {};
     ASSERT_TRUE(ask("com.first"));
@@ -340,8 +343,8 @@ TEST_F(Create, ExceptionsCleanUp) {
     EXPECT_TRUE(ask("com.example")); // the lock is free, and nothing of the container was there
 }
 
-// Goal: one identifier is made once, every client sees the same container and one of them that it did not exist; listings
-// show only whole containers. Method: many threads, a few identifiers, a lister beside them.
+// Goal: one identifier is made once, every client sees the same container and one of them that it did not exist;
+// listings show only whole containers. Method: many threads, a few identifiers, a lister beside them.
 TEST_F(Create, ManyClientsAtOnce) {
     constexpr int threadCount = 6;
     constexpr int identifiers = 12;

@@ -16,8 +16,8 @@ using support::LogLine;
 
 const std::string logPath = "private/var/root/Library/Logs/Zorvane/zorvaned.log";
 
-// Goal: the log is opened by name, sent to its file, with sizes by the kind of build; without a handle the daemon goes on.
-// Method: a table.
+// Goal: the log is opened by name, sent to its file, with sizes by the kind of build; without a handle the daemon goes
+// on. Method: a table.
 TEST(DaemonLife, OpensItsLog) {
     struct Row {
         bool internal;
@@ -43,7 +43,8 @@ TEST(DaemonLife, OpensItsLog) {
         } else if (row.level == 7) {
             ASSERT_FALSE(said.empty());
             EXPECT_EQ(said.back().function, "main");
-            EXPECT_TRUE(said.back().message.starts_with("zorvaned built at ") && said.back().message.ends_with(" started"));
+            EXPECT_TRUE(said.back().message.starts_with("zorvaned built at ") &&
+                        said.back().message.ends_with(" started"));
         } else {
             EXPECT_TRUE(said.empty());
         }
@@ -134,8 +135,8 @@ TEST(DaemonLife, FollowsTheLockState) {
     EXPECT_EQ(failing.log.take(), (std::vector<LogLine>{{3, "main", "register failed for lockstate: 28"}}));
 }
 
-// Goal: a launch serves when it says that it is ready, is busy until then, and ends when told; without the listener it goes
-// on, without the upcall port it does not. Method: whole runs, with something in the place of a socket.
+// Goal: a launch serves when it says that it is ready, is busy until then, and ends when told; without the listener it
+// goes on, without the upcall port it does not. Method: whole runs, with something in the place of a socket.
 TEST(DaemonLife, RunsUntilToldToStop) {
     enum class Blocked { nothing, listener, upcall };
     for (const Blocked blocked : {Blocked::nothing, Blocked::listener, Blocked::upcall}) {
@@ -163,8 +164,8 @@ TEST(DaemonLife, RunsUntilToldToStop) {
         if (blocked == Blocked::upcall) {
             ASSERT_GE(said.size(), 2U);
             EXPECT_EQ(said[said.size() - 2].function, "ZORKernServerStart");
-            EXPECT_TRUE(said[said.size() - 2].message.starts_with(
-                std::string(roles.upcallPort.checkInCallName()) + ": "))
+            EXPECT_TRUE(
+                said[said.size() - 2].message.starts_with(std::string(roles.upcallPort.checkInCallName()) + ": "))
                 << said[said.size() - 2];
         }
         EXPECT_TRUE(world.bootMarker.state.present);

@@ -51,8 +51,9 @@ TEST_F(DeathRow, EqualNamesDoNotCollideAndMissingItemsAreNoFailure) {
     EXPECT_EQ(pass(), ErrorCode::success);
 }
 
-// Goal: a pass that takes the fresh unique directory for rubbish costs nothing: the item gets there all the same, and its
-// move is not mistaken for that of a missing item. Method: the unique directories go just before the move, once, and always.
+// Goal: a pass that takes the fresh unique directory for rubbish costs nothing: the item gets there all the same, and
+// its move is not mistaken for that of a missing item. Method: the unique directories go just before the move, once,
+// and always.
 TEST_F(DeathRow, APassRacesAMove) {
     for (const bool always : {false, true}) {
         world.makeDirectories("item");
@@ -79,7 +80,8 @@ TEST_F(DeathRow, APassRacesAMove) {
     }
 }
 
-// Goal: moves and passes at once lose nothing and leave nothing. Method: threads that condemn, with passes of their own.
+// Goal: moves and passes at once lose nothing and leave nothing. Method: threads that condemn, with passes of their
+// own.
 TEST_F(DeathRow, ManyMovesAndPasses) {
     constexpr int itemsOfEach = 40;
     std::vector<std::thread> threads;
@@ -121,8 +123,8 @@ TEST_F(DeathRow, FailingMovesAreError41) {
     EXPECT_TRUE(world.exists("item"));
 }
 
-// Goal: what cannot be removed goes to the directory for temporary files; what cannot go there stays, is said, and is tried
-// again; other items go meanwhile. Method: removal fails for one file, then the move too.
+// Goal: what cannot be removed goes to the directory for temporary files; what cannot go there stays, is said, and is
+// tried again; other items go meanwhile. Method: removal fails for one file, then the move too.
 TEST_F(DeathRow, WhatCannotBeRemoved) {
     world.log.setLevel(logLevelDebug);
     const auto stuck = [](const DiskCallInfo& call) {
@@ -168,7 +170,8 @@ TEST_F(DeathRow, ADeathRowThatIsNoDirectory) {
     EXPECT_TRUE(world.item(dead).starts_with("directory"));
 }
 
-// Goal: the daemon counts as busy from the call until the pass has run, so a stop waits. Method: the queue stands still.
+// Goal: the daemon counts as busy from the call until the pass has run, so a stop waits. Method: the queue stands
+// still.
 TEST_F(DeathRow, APassKeepsTheDaemonBusy) {
     platform::Platform roles = world.linux().roles();
     roles.deathRowQueue.suspend();

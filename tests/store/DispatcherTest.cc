@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// The way of a message: who is admitted to which command, what is said and done to those who are not, who sends the reply,
-// and the commands for containers from a request's keys to a reply's.
+// The way of a message: who is admitted to which command, what is said and done to those who are not, who sends the
+// reply, and the commands for containers from a request's keys to a reply's.
 #include "daemon/commands/Commands.h"
 #include "platform/EntitlementKeys.h"
 #include "world/World.h"
@@ -75,9 +75,7 @@ protected:
     void as(std::shared_ptr<const platform::IdentityGrant> granted, std::uint32_t userId = mobile) {
         connection.peer_.identity = {.pid = peerPid, .effectiveUserId = userId, .grant = std::move(granted)};
     }
-    void handle(platform::ServiceEvent event) {
-        world.services().dispatcher().ZORProcessIpsiEvent(connection, event);
-    }
+    void handle(platform::ServiceEvent event) { world.services().dispatcher().ZORProcessIpsiEvent(connection, event); }
     /// The one reply; the connection must have stayed open.
     Dictionary request(const Dictionary& message) {
         const auto channel = std::make_shared<FakeReply>();
@@ -103,8 +101,8 @@ protected:
     static std::uint64_t errorOf(const Dictionary& reply) { return reply.unsignedInteger("ReplyError").value_or(0); }
     static LogLine missing(const std::string& identifier, std::string_view entitlement) {
         return {3, admission,
-                "connection attempt from pid 4711 (" + identifier + ") missing required entitlement: " +
-                    std::string(entitlement)};
+                "connection attempt from pid 4711 (" + identifier +
+                    ") missing required entitlement: " + std::string(entitlement)};
     }
 
     World world;
@@ -129,7 +127,9 @@ TEST_F(Dispatch, Refusals) {
     };
     const Row rows[] = {
         {"command 23", grant("a", everything), {{"Command", 23}}, {{3, handler, "Invalid command index: 23"}}},
-        {"command 2^32", grant("a", everything), {{"Command", std::uint64_t{1} << 32}},
+        {"command 2^32",
+         grant("a", everything),
+         {{"Command", std::uint64_t{1} << 32}},
          {{3, handler, "Invalid command index: 4294967296"}}},
         {"the largest command", nullptr, {{"Command", ~std::uint64_t{0}}}, {{3, handler, "Invalid command index: -1"}}},
         {"unknown, needs none", nullptr, {}, {noEntry}},
@@ -140,11 +140,17 @@ TEST_F(Dispatch, Refusals) {
         {"allowed is false", with(powers::allowed, false), list, {missing("com.example", powers::allowed)}},
         {"allowed is a number", with(powers::allowed, 1), list, {missing("com.example", powers::allowed)}},
         {"only another power", with(powers::otherIdLookup, true), list, {missing("com.example", powers::allowed)}},
-        {"wipe is no array", with(powers::wipeContainer, true), wipe,
+        {"wipe is no array",
+         with(powers::wipeContainer, true),
+         wipe,
          {noWipe, missing("com.example", powers::wipeContainer)}},
-        {"wipe is missing", grant("com.example", noPowers), wipe,
+        {"wipe is missing",
+         grant("com.example", noPowers),
+         wipe,
          {noWipe, missing("com.example", powers::wipeContainer)}},
-        {"wipe is no admission elsewhere", with(powers::wipeContainer, Array{"x"}), list,
+        {"wipe is no admission elsewhere",
+         with(powers::wipeContainer, Array{"x"}),
+         list,
          {missing("com.example", powers::allowed)}},
     };
     for (const Row& row : rows) {
@@ -156,8 +162,8 @@ TEST_F(Dispatch, Refusals) {
     EXPECT_EQ(world.services().dispatcher().counts().served, 0U);
 }
 
-// Goal: exactly the entitled are admitted to each of the 23 commands, and each that is admitted gets exactly one reply with
-// "ReplyError". Method: all commands against all kinds of peer.
+// Goal: exactly the entitled are admitted to each of the 23 commands, and each that is admitted gets exactly one reply
+// with "ReplyError". Method: all commands against all kinds of peer.
 TEST_F(Dispatch, EveryCommandAdmitsByItsEntitlement) {
     const std::set<std::uint64_t> unguarded = {0, 13, 15, 16, 17};
     enum class Admits { none, basic, basicAndWipe, all };
@@ -220,7 +226,8 @@ TEST_F(Dispatch, EventsThatAreNoMessages) {
     EXPECT_FALSE(world.exists(mobileContainers));
 }
 
-// Goal: the reply to the emptying of death row comes once, when the pass has run, with its code. Method: hold the queue.
+// Goal: the reply to the emptying of death row comes once, when the pass has run, with its code. Method: hold the
+// queue.
 TEST_F(Dispatch, TheDeferredReplyComesOnceAfterThePass) {
     as(grant("com.example", everything));
     world.makeDirectories(std::string(cachesPath) + "/Dead/temp.abcdef/old");
@@ -273,7 +280,10 @@ TEST_F(Dispatch, CreatesAndLooksUp) {
         {"com.example", mobile, {{"ContainerClass", 0}, {"UserID", 1}}, 11},
         {"com.example", mobile, {{"ContainerClass", 2}}, 38},
         {std::nullopt, mobile, {{"ContainerClass", 2}, {"UserID", 1}, {"CreateIfNecessary", create}}, 11},
-        {"com.example", mobile, {{"ContainerClass", 2}, {"UserID", 1}, {"CreateIfNecessary", 1}, {"Identifier", "b"}}, 21},
+        {"com.example",
+         mobile,
+         {{"ContainerClass", 2}, {"UserID", 1}, {"CreateIfNecessary", 1}, {"Identifier", "b"}},
+         21},
         {"com.example", mobile, {{"ContainerClass", 12}, {"UserID", 499}, {"CreateIfNecessary", create}}, 55},
         {"com.example", 0, {{"ContainerClass", 2}, {"UserID", 1}, {"Identifier", 5}}, 1}, // no string: its own
         {"com.example", 0, {{"ContainerClass", 2}, {"UserID", -501}}, 38},
@@ -292,16 +302,13 @@ TEST_F(Dispatch, CreatesAndLooksUp) {
 TEST_F(Dispatch, Lists) {
     as(grant("com.example", everything), 0);
     const Dictionary list{{"Command", 1}, {"ContainerClass", 2}, {"UserID", 1}};
-    EXPECT_EQ(request(list), (Dictionary{{"ReplyError", std::uint64_t{1}},
-                                         {"ReplyIdsArray", Array{}},
-                                         {"ReplyUUIDsArray", Array{}}}));
+    EXPECT_EQ(request(list),
+              (Dictionary{{"ReplyError", std::uint64_t{1}}, {"ReplyIdsArray", Array{}}, {"ReplyUUIDsArray", Array{}}}));
     std::map<std::string, plist::Data> uuids;
     for (const char* identifier : {"a", "b", "c"})
-        uuids[identifier] = *request({{"ContainerClass", 2},
-                                      {"UserID", 1},
-                                      {"Identifier", identifier},
-                                      {"CreateIfNecessary", true}})
-                                 .data("ReplyUUID");
+        uuids[identifier] =
+            *request({{"ContainerClass", 2}, {"UserID", 1}, {"Identifier", identifier}, {"CreateIfNecessary", true}})
+                 .data("ReplyUUID");
     const Dictionary reply = request(list);
     ASSERT_TRUE(reply.array("ReplyIdsArray") && reply.array("ReplyUUIDsArray"));
     ASSERT_EQ(reply.array("ReplyIdsArray")->size(), 3U);
@@ -319,8 +326,8 @@ TEST_F(Dispatch, Lists) {
               (Dictionary{{"ReplyError", std::uint64_t{38}}}));
 }
 
-// Goal: a client that is refused over and over cannot fill the log, and another user's lines are not lost for it. Method:
-// more refusals than a second's share.
+// Goal: a client that is refused over and over cannot fill the log, and another user's lines are not lost for it.
+// Method: more refusals than a second's share.
 TEST_F(Dispatch, RefusalsAreLimitedForEachUser) {
     constexpr std::size_t refusals = 2000;
     for (std::size_t i = 0; i < refusals; ++i)

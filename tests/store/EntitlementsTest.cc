@@ -31,8 +31,7 @@ std::string missingMessage(const World& world) {
 TEST(EntitlementMapping, AMissingFileIsAnEmptyMap) {
     World world;
     EXPECT_EQ(world.services().entitlements().entryCount(), 0U);
-    EXPECT_EQ(world.log.take(),
-              (std::vector<LogLine>{{3, "_readEntitlementMappingFromDisk", missingMessage(world)}}));
+    EXPECT_EQ(world.log.take(), (std::vector<LogLine>{{3, "_readEntitlementMappingFromDisk", missingMessage(world)}}));
     EXPECT_FALSE(world.exists(file));
     EXPECT_FALSE(world.services().entitlements().lostFile());
     ASSERT_TRUE(world.services().entitlements()._setEntitlementDictionaryValues({Dictionary{{"k", true}}}, {"a"}));
@@ -40,8 +39,8 @@ TEST(EntitlementMapping, AMissingFileIsAnEmptyMap) {
     EXPECT_TRUE(world.read(file).starts_with("bplist00"));
 }
 
-// Goal: what each entitlement value means, and what is said of those that mean nothing. Method: one identifier a row, in a
-// file that a daemon reads.
+// Goal: what each entitlement value means, and what is said of those that mean nothing. Method: one identifier a row,
+// in a file that a daemon reads.
 TEST(EntitlementMapping, Queries) {
     struct Row {
         const char* identifier;
@@ -56,21 +55,36 @@ TEST(EntitlementMapping, Queries) {
     const Row rows[] = {
         {"none", {{"other", 1}}, {}, {}, {}},
         {"one", {{apps, "g"}, {groups, "systemgroup.a"}}, Strings{"g"}, Strings{"systemgroup.a"}, {}},
-        {"many", {{apps, Array{"b", "a", "b"}}, {groups, Array{"systemgroup.b", "systemgroup.a", "systemgroup.b"}}},
-         Strings{"a", "b"}, Strings{"systemgroup.a", "systemgroup.b"}, {}},
+        {"many",
+         {{apps, Array{"b", "a", "b"}}, {groups, Array{"systemgroup.b", "systemgroup.a", "systemgroup.b"}}},
+         Strings{"a", "b"},
+         Strings{"systemgroup.a", "systemgroup.b"},
+         {}},
         {"empty", {{apps, Array{}}, {groups, Array{}}}, Strings{}, {}, {}},
         {"number", {{apps, Array{"a", 1}}}, {}, {}, {std::string("Entitlement ") + apps + " for number" + noString}},
-        {"wrong", {{apps, true}, {groups, Dictionary{}}}, {}, {},
+        {"wrong",
+         {{apps, true}, {groups, Dictionary{}}},
+         {},
+         {},
          {std::string("Entitlement ") + apps + " for wrong" + noType,
           std::string("Entitlement ") + groups + " for wrong" + noType}},
-        {"prefix", {{groups, Array{"systemgroup.a", "b", "systemgroup"}}}, {}, Strings{"systemgroup.a"},
+        {"prefix",
+         {{groups, Array{"systemgroup.a", "b", "systemgroup"}}},
+         {},
+         Strings{"systemgroup.a"},
          {"System group ID b" + noPrefix, "System group ID systemgroup" + noPrefix}},
         {"alternative", {{groupContainers, "systemgroup.c"}}, {}, Strings{"systemgroup.c"}, {}},
         {"both", {{groups, "systemgroup.a"}, {groupContainers, "systemgroup.c"}}, {}, Strings{"systemgroup.a"}, {}},
         {"emptyFirst", {{groups, Array{}}, {groupContainers, "systemgroup.c"}}, {}, Strings{"systemgroup.c"}, {}},
-        {"badFirst", {{groups, 1}, {groupContainers, "systemgroup.c"}}, {}, Strings{"systemgroup.c"},
+        {"badFirst",
+         {{groups, 1}, {groupContainers, "systemgroup.c"}},
+         {},
+         Strings{"systemgroup.c"},
          {std::string("Entitlement ") + groups + " for badFirst" + noType}},
-        {"unprefixedFirst", {{groups, "x"}, {groupContainers, "systemgroup.c"}}, {}, Strings{},
+        {"unprefixedFirst",
+         {{groups, "x"}, {groupContainers, "systemgroup.c"}},
+         {},
+         Strings{},
          {"System group ID x" + noPrefix}},
     };
     World world;
@@ -121,7 +135,7 @@ TEST(EntitlementMapping, SettingWritesOnceWhenSomethingChanges) {
         return world.services().entitlements()._setEntitlementDictionaryValues(values, identifiers);
     };
     const auto inode = [&] {
-        struct stat status {};
+        struct stat status{};
         return ::stat(world.path(file).c_str(), &status) == 0 ? status.st_ino : 0;
     };
     const Dictionary a{{apps, Array{"g"}}};
@@ -142,7 +156,8 @@ TEST(EntitlementMapping, SettingWritesOnceWhenSomethingChanges) {
     EXPECT_EQ(counts.error().description(), "Can't act on an invalid input: values count: 1, IDs count: 2");
     std::size_t renames = 0;
     world.disk().arm({.filter = [&](const support::DiskCallInfo& call) {
-        renames += call.call == support::DiskCall::rename && call.subject.find("zor_entitlements.plist") != std::string::npos;
+        renames +=
+            call.call == support::DiskCall::rename && call.subject.find("zor_entitlements.plist") != std::string::npos;
         return false;
     }});
     world.log.setLevel(logLevelDebug);
@@ -161,8 +176,8 @@ TEST(EntitlementMapping, SettingWritesOnceWhenSomethingChanges) {
     EXPECT_TRUE(mapping.entitlementsExistForIdentifier("c"));
 }
 
-// Goal: a save that fails is error 59, the change stays in memory and the old file on disk, whichever call fails. Method:
-// fail each call of a save in turn.
+// Goal: a save that fails is error 59, the change stays in memory and the old file on disk, whichever call fails.
+// Method: fail each call of a save in turn.
 TEST(EntitlementMapping, AFailedSave) {
     World world;
     ASSERT_TRUE(world.services().entitlements()._setEntitlementDictionaryValues({Dictionary{{"k", 1}}}, {"old"}));
@@ -293,8 +308,8 @@ TEST(Whitelist, BuiltInTables) {
         EXPECT_EQ(*table.wellknownSystemGroupContainerForId(identifier), identifier);
 }
 
-// Goal: the table of the file stands in place of the built-in one; a row that could lead anywhere else is said and left out;
-// a file that cannot be believed is said and not used. Method: a table of rows; then files.
+// Goal: the table of the file stands in place of the built-in one; a row that could lead anywhere else is said and left
+// out; a file that cannot be believed is said and not used. Method: a table of rows; then files.
 TEST(Whitelist, TheTableFile) {
     World world;
     const std::string longest(255, 'n');

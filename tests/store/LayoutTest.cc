@@ -11,8 +11,8 @@ namespace {
 
 using support::LogLine;
 
-// Goal: each getter gives its place and makes it, again after it went. Method: a table; everything is removed between two
-// calls of each.
+// Goal: each getter gives its place and makes it, again after it went. Method: a table; everything is removed between
+// two calls of each.
 TEST(Layout, ProcessWideDirectories) {
     const std::string caches = cachesPath;
     const std::string library = libraryPath;
@@ -83,7 +83,9 @@ TEST(Layout, ClassDirectories) {
             const auto containerClass = static_cast<ContainerClass>(number);
             const bool bundle = isBundleClass(containerClass);
             const bool system = isSystemClass(containerClass);
-            std::string expected = transient ? (bundle ? transientBundle : system ? transientSystem : transientUser)
+            std::string expected = transient ? (bundle   ? transientBundle
+                                                : system ? transientSystem
+                                                         : transientUser)
                                              : std::string(bundle || system ? sharedPath : mobileContainers) + "/";
             expected += className(containerClass);
             const auto url =
@@ -94,11 +96,12 @@ TEST(Layout, ClassDirectories) {
         }
     EXPECT_EQ(world.item(mobileContainers), directoryOf(mobile));
     EXPECT_EQ(world.item(std::string(mobileCaches) + "/Temp"), directoryOf(mobile));
-    EXPECT_EQ(world.log.take(), (std::vector<LogLine>{{3, "initWithUserId",
-                                                       "user home Dir: " + world.path("private/var/mobile")}}));
+    EXPECT_EQ(world.log.take(),
+              (std::vector<LogLine>{{3, "initWithUserId", "user home Dir: " + world.path("private/var/mobile")}}));
 }
 
-// Goal: which users and classes have no place, and what is said each time. Method: a table; nothing may be made for them.
+// Goal: which users and classes have no place, and what is said each time. Method: a table; nothing may be made for
+// them.
 TEST(Layout, PlacesThatDoNotExist) {
     struct Row {
         std::uint32_t userId;
@@ -118,11 +121,13 @@ TEST(Layout, PlacesThatDoNotExist) {
                            Row{33, 2, {{3, "initWithUserId", "userId: 33 must be in range"}}},
                            Row{500, 0, {{3, "initWithUserId", "userId: 500 must be in range"}}},
                            Row{511, 2, {{3, "initWithUserId", "userId: 511 must be in range"}}},
-                           Row{504, 2, {{3, "initWithUserId", "Failed to getpwuid for uid: 504"},
-                                        {3, "initWithUserId", "user home Dir: (null)"}}},
+                           Row{504,
+                               2,
+                               {{3, "initWithUserId", "Failed to getpwuid for uid: 504"},
+                                {3, "initWithUserId", "user home Dir: (null)"}}},
                            Row{504, 2, {}}}) {
-        EXPECT_FALSE(configuration.containerDirectoryURLForUser(row.userId,
-                                                                static_cast<ContainerClass>(row.containerClass), false));
+        EXPECT_FALSE(configuration.containerDirectoryURLForUser(
+            row.userId, static_cast<ContainerClass>(row.containerClass), false));
         EXPECT_EQ(world.log.take(), row.lines) << row.userId;
     }
     struct Home {
@@ -137,7 +142,8 @@ TEST(Layout, PlacesThatDoNotExist) {
     EXPECT_FALSE(world.exists("private/var/nowhere"));
 }
 
-// Goal: a home may be reached through the administrator's link; below it a user's link leads nowhere. Method: both kinds.
+// Goal: a home may be reached through the administrator's link; below it a user's link leads nowhere. Method: both
+// kinds.
 TEST(Layout, LinksToAndBelowAHome) {
     World world;
     world.write("etc/passwd", "mobile:x:501:501::/private/var/alias:/bin/sh\n");

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // The metadata file: every way in which one is refused, what is accepted all the same, and what is written.
-#include "store/ZORMetadata.h"
 #include "plist/Read.h"
+#include "store/ZORMetadata.h"
 #include "world/World.h"
 
 #include <functional>
@@ -28,16 +28,15 @@ protected:
     }
     [[nodiscard]] Dictionary onDisk() const {
         const std::string bytes = world.read(metadataPath);
-        const auto value =
-            plist::readPropertyList({reinterpret_cast<const std::uint8_t*>(bytes.data()), bytes.size()});
+        const auto value = plist::readPropertyList({reinterpret_cast<const std::uint8_t*>(bytes.data()), bytes.size()});
         return value && value->asDictionary() ? *value->asDictionary() : Dictionary();
     }
     static Dictionary good() { return metadataOf(2, mobile, "com.example.app"); }
     World world;
 };
 
-// Goal: the first failing step decides, with its own words. Method: one change to a good file for each row; the last row
-// fails every step at once.
+// Goal: the first failing step decides, with its own words. Method: one change to a good file for each row; the last
+// row fails every step at once.
 TEST_F(Metadata, RefusesByTheFirstFailingStep) {
     struct Row {
         std::string name;
@@ -45,9 +44,7 @@ TEST_F(Metadata, RefusesByTheFirstFailingStep) {
         ErrorCode code;
         std::string message; // @ stands for the container's path
     };
-    const auto set = [](const char* key, Value value) {
-        return [=](Dictionary& content) { content.set(key, value); };
-    };
+    const auto set = [](const char* key, Value value) { return [=](Dictionary& content) { content.set(key, value); }; };
     const auto drop = [](const char* key) { return [=](Dictionary& content) { content.erase(key); }; };
     constexpr auto invalid = ErrorCode::metadataInvalid;
     const std::string applications = world.path(mobileContainers);
@@ -73,10 +70,7 @@ TEST_F(Metadata, RefusesByTheFirstFailingStep) {
          "Invalid metadata Info: " + plist::describe(std::make_unique<Value>(Array{}).get()) + " at @"},
         {"other class", set("ZORMetadataContentClass", 4), invalid,
          "Invalid metadata-URLs should match: @ : " + applications + "/Data/KolvexPlugin"},
-        {"all wrong",
-         [](Dictionary& content) {
-             content = {{"ZORMetadataPersona", 33}, {"ZORMetadataInfo", 1}};
-         },
+        {"all wrong", [](Dictionary& content) { content = {{"ZORMetadataPersona", 33}, {"ZORMetadataInfo", 1}}; },
          invalid, "Incorrect UserId: 33, expecting: 501 at @"},
     };
     for (const Row& row : rows) {
@@ -95,8 +89,8 @@ TEST_F(Metadata, RefusesByTheFirstFailingStep) {
     }
 }
 
-// Goal: only a file that the daemon itself can have written counts. Method: what a container's owner can put in its place,
-// with good content where it has content; each must be answered at once with 12.
+// Goal: only a file that the daemon itself can have written counts. Method: what a container's owner can put in its
+// place, with good content where it has content; each must be answered at once with 12.
 TEST_F(Metadata, HostileFilesReadAsUnreadable) {
     const std::string bytes = binary(good());
     const std::string file = world.path(metadataPath);
@@ -168,8 +162,8 @@ TEST_F(Metadata, TheClassPathIsCheckedOnlyWhereAsked) {
     EXPECT_EQ((*record)->containerClass(), ContainerClass::dataKolvexPlugin);
 }
 
-// Goal: any form is read, one form is written: binary, upper-case UUID, info only when there is some, 0644. Method: an XML
-// file with a lower-case UUID, read and written back.
+// Goal: any form is read, one form is written: binary, upper-case UUID, info only when there is some, 0644. Method: an
+// XML file with a lower-case UUID, read and written back.
 TEST_F(Metadata, IsWrittenInOneForm) {
     world.makeDirectories(container);
     world.write(metadataPath, "<?xml version=\"1.0\"?><plist version=\"1.0\"><dict>"

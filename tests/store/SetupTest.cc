@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// The setup of a launch and of a boot: what counts as orphaned, what is swept, who is skipped; and the sandbox mappings.
+// The setup of a launch and of a boot: what counts as orphaned, what is swept, who is skipped; and the sandbox
+// mappings.
 #include "world/World.h"
 
 #include <gtest/gtest.h>
@@ -19,15 +20,15 @@ constexpr const char* lowerUuid = "abcdef00-0000-4000-8000-00000000000a";
 constexpr const char* bareUuid = "22222222-0000-4000-8000-000000000000";
 constexpr const char* cleanup = "_cleanupOrphanedDataForUser";
 
-// Goal: each entry of a class directory is kept or goes by its name and its metadata file alone. Method: a table over names,
-// files and classes, judged after one boot.
+// Goal: each entry of a class directory is kept or goes by its name and its metadata file alone. Method: a table over
+// names, files and classes, judged after one boot.
 TEST(Setup, Orphans) {
     World world;
-    world.write("etc/zorvane/wellknown.plist",
-                binary(plist::Dictionary{
-                    {"System", plist::Dictionary{{"com.veltra.settingsd", "com.veltra.settingsd"},
-                                                 {"com.veltra.other", "short-name"}}},
-                    {"SystemGroup", plist::Dictionary{{"systemgroup.com.veltra.fonts", "fonts"}}}}));
+    world.write(
+        "etc/zorvane/wellknown.plist",
+        binary(plist::Dictionary{{"System", plist::Dictionary{{"com.veltra.settingsd", "com.veltra.settingsd"},
+                                                              {"com.veltra.other", "short-name"}}},
+                                 {"SystemGroup", plist::Dictionary{{"systemgroup.com.veltra.fonts", "fonts"}}}}));
     enum class File { good, invalid, missing };
     struct Row {
         std::string directory;
@@ -61,7 +62,8 @@ TEST(Setup, Orphans) {
         const std::string path = row.directory + "/" + row.name;
         world.makeDirectories(path);
         if (row.file != File::missing)
-            world.write(path + "/" + names::metadataFile, row.file == File::good ? binary(metadataOf(2, mobile, "a")) : "");
+            world.write(path + "/" + names::metadataFile,
+                        row.file == File::good ? binary(metadataOf(2, mobile, "a")) : "");
     }
     world.makeDirectories(system + "/short-name-without-file");
     world.makeDirectories(applications + "/.hidden");
@@ -82,10 +84,11 @@ TEST(Setup, Orphans) {
     std::set<std::string> said;
     for (const std::string& message : world.log.take(3, cleanup))
         said.insert(message);
-    EXPECT_EQ(said, (std::set<std::string>{
-                        "Deleting orphaned data missing a metadata file at: " + world.path(applications + "/" + bareUuid),
-                        "Deleting orphaned data missing a metadata file at: " +
-                            world.path(std::string("private/var/second/Containers/Shared/AppGroup/") + bareUuid)}));
+    EXPECT_EQ(said,
+              (std::set<std::string>{
+                  "Deleting orphaned data missing a metadata file at: " + world.path(applications + "/" + bareUuid),
+                  "Deleting orphaned data missing a metadata file at: " +
+                      world.path(std::string("private/var/second/Containers/Shared/AppGroup/") + bareUuid)}));
 }
 
 TEST(Setup, AnInternalBuildShowsWhatItDeletes) {
@@ -111,7 +114,8 @@ TEST(Setup, AnInternalBuildShowsWhatItDeletes) {
 }
 
 // Goal: a boot throws all transient containers away and touches no user without a home; the launch empties staging and
-// death row, and what it found out while setting up is forgotten. Method: containers of every kind before, a boot, a launch.
+// death row, and what it found out while setting up is forgotten. Method: containers of every kind before, a boot, a
+// launch.
 TEST(Setup, BootAndLaunch) {
     World world;
     const std::string identifier = "com.example";
@@ -186,7 +190,8 @@ TEST(Setup, GoesOnAfterFailures) {
     EXPECT_TRUE(world.exists(std::string(cachesPath) + "/Staging/half-made"));
 }
 
-// Goal: a mapping is removed, then set; either failure is said and is the answer. Method: a table over class and failure.
+// Goal: a mapping is removed, then set; either failure is said and is the answer. Method: a table over class and
+// failure.
 TEST(SandboxMapping, RemovesThenSets) {
     World world;
     world.load();
@@ -196,9 +201,8 @@ TEST(SandboxMapping, RemovesThenSets) {
     const auto map = [&](ContainerClass containerClass, const std::optional<FileURL>& to) {
         return world.daemonsClient()._setSandboxContainerMappingForUser(mobile, identifier, containerClass, to);
     };
-    for (const ContainerClass unsupported :
-         {ContainerClass::bundleApplication, ContainerClass::dataSystem, ContainerClass::sharedSystemGroup,
-          ContainerClass::undefined}) {
+    for (const ContainerClass unsupported : {ContainerClass::bundleApplication, ContainerClass::dataSystem,
+                                             ContainerClass::sharedSystemGroup, ContainerClass::undefined}) {
         EXPECT_FALSE(map(unsupported, url));
         EXPECT_EQ(world.log.take(), (std::vector<LogLine>{{3, "_setSandboxContainerMappingForUser",
                                                            "Unsupported class for setting sandbox container mapping: " +
@@ -226,11 +230,12 @@ TEST(SandboxMapping, RemovesThenSets) {
         world.sandbox.setError = ENOSPC;
         EXPECT_FALSE(map(row.containerClass, url));
         world.sandbox.setError = 0;
-        EXPECT_EQ(world.log.take(3, "_setSandboxContainerMappingForUser"),
-                  (std::vector<std::string>{"Failed to remove mapping for user: 501, itemType: " + std::string(row.type) +
-                                                ", identifier: com.example/odd, " + tail + "(null) : 5",
-                                            "Failed to set mapping for user: 501, itemType: " + std::string(row.type) +
-                                                ", identifier com.example/odd, " + tail + url.path() + " : 28"}));
+        EXPECT_EQ(
+            world.log.take(3, "_setSandboxContainerMappingForUser"),
+            (std::vector<std::string>{"Failed to remove mapping for user: 501, itemType: " + std::string(row.type) +
+                                          ", identifier: com.example/odd, " + tail + "(null) : 5",
+                                      "Failed to set mapping for user: 501, itemType: " + std::string(row.type) +
+                                          ", identifier com.example/odd, " + tail + url.path() + " : 28"}));
     }
     // A stop between the move of a container and its mapping leaves one that points to nothing; the launch removes it.
     ASSERT_TRUE(map(ContainerClass::dataApplication, world.url("private/var/mobile/gone")));
@@ -238,8 +243,8 @@ TEST(SandboxMapping, RemovesThenSets) {
     world.daemonsClient().containerManagerSetup();
     EXPECT_TRUE(world.names("run/zorvane/sandbox/501/1").empty());
     EXPECT_EQ(world.names("run/zorvane/sandbox/501/2").size(), 1U);
-    EXPECT_TRUE(hasLine(world.log.take(), 5, "containerManagerSetup",
-                        "Removed 1 sandbox mappings whose container is gone"));
+    EXPECT_TRUE(
+        hasLine(world.log.take(), 5, "containerManagerSetup", "Removed 1 sandbox mappings whose container is gone"));
 }
 
 } // namespace

@@ -102,8 +102,7 @@ inline std::string withoutSourceLine(const std::string& message) {
     return digits > 0 && message.compare(digits, 2, ": ") == 0 ? message.substr(digits + 2) : message;
 }
 
-inline bool hasLine(const std::vector<LogLine>& lines, int level, std::string_view function,
-                    std::string_view message) {
+inline bool hasLine(const std::vector<LogLine>& lines, int level, std::string_view function, std::string_view message) {
     return std::ranges::any_of(lines, [&](const LogLine& line) {
         return line.level == level && line.function == function &&
                (line.message == message || withoutSourceLine(line.message) == message);

@@ -21,7 +21,9 @@ constexpr const char* passwd = "root:x:0:0::/private/var/root:/bin/sh\n"
                                "second:x:502:502::/private/var/second:/bin/sh\n"
                                "homeless:x:503:503::/private/var/nowhere:/bin/sh\n";
 
-bool canGiveAway() { return ::geteuid() == 0; }
+bool canGiveAway() {
+    return ::geteuid() == 0;
+}
 
 platform::Platform withRoles(const platform::Platform& real, World& world) {
     return {.root = real.root,
@@ -52,7 +54,7 @@ void require(bool done, const std::string& what) {
 } // namespace
 
 std::string itemAt(const std::string& path) {
-    struct stat status {};
+    struct stat status{};
     if (::lstat(path.c_str(), &status) != 0)
         return "missing";
     const char* kind = S_ISDIR(status.st_mode) ? "directory" : S_ISREG(status.st_mode) ? "file" : "other";

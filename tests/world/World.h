@@ -1,10 +1,11 @@
 // SPDX-License-Identifier: Apache-2.0
-// A device of a test's own: a temporary root with the accounts and homes that the daemon expects, the Linux platform over
-// it with some roles in the test's hand, and one daemon's services, which may be ended and begun anew on the same disk.
+// A device of a test's own: a temporary root with the accounts and homes that the daemon expects, the Linux platform
+// over it with some roles in the test's hand, and one daemon's services, which may be ended and begun anew on the same
+// disk.
 //
-// Everything a client is shown or a log line says is the real thing. In the test's hand: the disk may fail (`disk`), the log
-// keeps its lines, the build may be internal, the device may be locked, the boot is a flag. One thread makes, restarts and
-// ends a world.
+// Everything a client is shown or a log line says is the real thing. In the test's hand: the disk may fail (`disk`),
+// the log keeps its lines, the build may be internal, the device may be locked, the boot is a flag. One thread makes,
+// restarts and ends a world.
 #pragma once
 
 #include "daemon/Composition.h"
