@@ -1,4 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
+// The public calls: what each sends and what it expects back.
 #include "zorvane/Client.h"
 
 #include "Connection.h"

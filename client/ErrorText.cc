@@ -1,4 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
+// What the daemon's codes mean to people, in one table.
 #include "zorvane/Error.h"
 
 namespace zorvane {

@@ -1,4 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
+// The answer to commands that this version does not serve: an error, and a line in the log.
 #include "daemon/commands/Commands.h"
 
 namespace zor::commands {
