@@ -10,6 +10,7 @@
 #include <dirent.h>
 #include <fstream>
 #include <memory>
+#include <random>
 #include <thread>
 
 namespace zor::platform::test {
@@ -188,6 +189,71 @@ TEST(ListenerPool, CountsStayRightUnderMixedLoad) {
     EXPECT_TRUE(eventually([&] { return world.listener().counters().threads == 2; }));
     EXPECT_EQ(world.listener().counters().threadsBlocked, 0U);
     EXPECT_EQ(world.listener().counters().messages, 8U * 400);
+}
+
+// Goal: connections that end at any moment leave no charge, no event and no reply to a later one of the same object.
+// Method: clients that leave at random points while replies come at once, late from another thread, large, or never.
+TEST(ListenerPool, ConnectionsEndWhileRepliesAreUnderWay) {
+    ListenerWorld world;
+    world.limits.outputBytesPaused = 50'000;
+    std::mutex mutex;
+    std::vector<std::shared_ptr<ReplyChannel>> late;
+    std::atomic<bool> done{false};
+    world.start([&](PeerConnection& connection, ServiceEvent& event) {
+        switch (*event.request.unsignedInteger("Number") % 6) {
+        case 0: {
+            const std::lock_guard lock(mutex);
+            late.push_back(event.reply);
+            return;
+        }
+        case 1:
+            event.reply->send(
+                {{"Number", event.request.unsignedInteger("Number").value()}, {"Large", plist::Data(100'000, 1)}});
+            return;
+        case 2:
+            if (*event.request.unsignedInteger("Number") % 5 == 0)
+                connection.cancel();
+            return;
+        default:
+            event.reply->send(event.request);
+        }
+    });
+    std::thread replier([&] {
+        while (!done) {
+            std::vector<std::shared_ptr<ReplyChannel>> taken;
+            {
+                const std::lock_guard lock(mutex);
+                taken.swap(late);
+            }
+            for (const auto& reply : taken)
+                reply->send({{"Large", plist::Data(70'000, 2)}});
+            std::this_thread::yield();
+        }
+    });
+    std::vector<std::thread> clients;
+    for (std::uint64_t seed = 0; seed < 6; ++seed)
+        clients.emplace_back([&, seed] {
+            std::mt19937_64 random(seed);
+            for (int life = 0; life < 150; ++life) {
+                RawClient client(world.socketPath());
+                const std::uint64_t first = random() << 32U;
+                const std::uint64_t requests = random() % 12;
+                for (std::uint64_t i = 0; i < requests; ++i)
+                    if (!client.send(numbered((random() & 0xFF)), first + i))
+                        break;
+                for (std::uint64_t replies = random() % 3; replies > 0 && requests > 4; --replies) {
+                    const std::optional<Reply> reply = client.receiveIfAny();
+                    EXPECT_TRUE(!reply || (reply->id >= first && reply->id < first + requests));
+                }
+            }
+        });
+    for (std::thread& client : clients)
+        client.join();
+    EXPECT_TRUE(world.isAtRest());
+    done = true;
+    replier.join();
+    EXPECT_EQ(world.counts.invalids, static_cast<int>(world.listener().counters().connectionsAccepted));
+    EXPECT_EQ(world.counts.others, 0);
 }
 
 std::uint64_t switchesOfListenerThreads() {

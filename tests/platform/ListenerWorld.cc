@@ -107,6 +107,11 @@ std::optional<Reply> RawClient::receive() {
     return Reply{.id = header.id, .message = std::move(*value->asMutableDictionary())};
 }
 
+std::optional<Reply> RawClient::receiveIfAny() {
+    pollfd descriptor = {.fd = socket_.get(), .events = POLLIN, .revents = 0};
+    return ::poll(&descriptor, 1, 5) > 0 ? receive() : std::nullopt;
+}
+
 bool RawClient::ended() {
     std::uint8_t byte = 0;
     const ssize_t received = ::recv(socket_.get(), &byte, 1, 0);

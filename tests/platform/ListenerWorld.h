@@ -53,6 +53,8 @@ public:
     bool send(const plist::Dictionary& message, std::uint64_t id) { return send(frameOf(message, id)); }
     /// nullopt at the end of the stream, on a reset, or when nothing comes.
     std::optional<Reply> receive();
+    /// The same, when something comes within a few milliseconds.
+    std::optional<Reply> receiveIfAny();
     /// Waits for the end of the stream or a reset; false when anything else comes, or nothing.
     bool ended();
     /// A request that comes back, so the listener is alive for this client.

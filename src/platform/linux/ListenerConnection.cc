@@ -184,14 +184,39 @@ void ListenerConnection::finish(Outcome outcome) {
         outcome = endWithIncident(ListenerIncident::tooMuchInput, static_cast<std::int64_t>(peer_->kernelUserId()));
     if (outcome == Outcome::requeue)
         return core_.pool.requeue(*this);
-    if (outcome == Outcome::wait) {
+    if (outcome == Outcome::end || !letGo())
+        close();
+}
+
+bool ListenerConnection::letGo() {
+    int descriptor = -1;
+    std::uint32_t events = 0;
+    {
         const MutexLock lock(mutex_);
+        if (over_)
+            return false;
+        events = eventsWanted();
+        Arming expected = Arming::no;
+        if (!arming_.compare_exchange_strong(expected, Arming::underway)) {
+            // The worker that had it before is not through yet. What it arms now is out of date, and it will see that.
+            held_ = !core_.pool.rearm(descriptor_, *this, events);
+            return !held_;
+        }
         held_ = false;
-        if (!over_ && core_.pool.rearm(descriptor_, *this, eventsWanted()))
-            return;
-        held_ = true;
+        descriptor = descriptor_;
     }
-    close();
+    const bool armed = core_.pool.rearm(descriptor, *this, events);
+    if (arming_.exchange(Arming::no) == Arming::closesAfterwards) {
+        release();
+        return true;
+    }
+    if (armed && eventsWanted() == events)
+        return true;
+    const MutexLock lock(mutex_);
+    if (!open_ || held_)
+        return true;
+    held_ = !core_.pool.rearm(descriptor_, *this, eventsWanted());
+    return !held_;
 }
 
 void ListenerConnection::close() {
@@ -202,7 +227,6 @@ void ListenerConnection::close() {
     ServiceEvent event = {.kind = ServiceEvent::Kind::invalid, .request = {}, .reply = nullptr};
     core_.handler(*this, event);
 
-    ListenerCharges::Account* account = nullptr;
     input_.close();
     channel_.reset();
     peer_.reset();
@@ -210,11 +234,22 @@ void ListenerConnection::close() {
         const MutexLock lock(mutex_);
         output_.close();
         core_.pool.remove(descriptor_);
+        open_ = false;
+        held_ = false;
+        Arming expected = Arming::underway;
+        if (arming_.compare_exchange_strong(expected, Arming::closesAfterwards))
+            return;
+    }
+    release();
+}
+
+void ListenerConnection::release() {
+    ListenerCharges::Account* account = nullptr;
+    {
+        const MutexLock lock(mutex_);
         socket_.reset();
         descriptor_ = -1;
         account = std::exchange(account_, nullptr);
-        open_ = false;
-        held_ = false;
     }
     core_.charges.closeConnection(*account);
     core_.recycle(*this);

@@ -68,7 +68,11 @@ private:
     Outcome endWithIncident(ListenerIncident incident, std::int64_t about);
     std::shared_ptr<Channel> channelFor(std::uint64_t id) ZOR_EXCLUDES(mutex_);
     void finish(Outcome outcome) ZOR_EXCLUDES(mutex_);
+    /// Gives the connection back to epoll. False when it has to be closed instead.
+    bool letGo() ZOR_EXCLUDES(mutex_);
     void close() ZOR_EXCLUDES(mutex_);
+    /// The end of close, and of this life.
+    void release() ZOR_EXCLUDES(mutex_);
 
     /// Sends one frame for a channel, if that still stands for a reply of this life.
     void transmit(Channel& channel, plist::Data& frame) ZOR_EXCLUDES(mutex_);
@@ -88,6 +92,9 @@ private:
 
     /// No more requests are served and no more replies sent. Once set it stays so for this life.
     std::atomic<bool> over_{false};
+
+    enum class Arming : std::uint8_t { no, underway, closesAfterwards };
+    std::atomic<Arming> arming_{Arming::no};
 
     Mutex mutex_;
     /// Closed only by the holder, who therefore may use descriptor_, the same number, without the mutex.
