@@ -122,6 +122,9 @@ function(zor_test area)
         return()
     endif()
     add_executable(zor_${area}_tests ${sources})
+    # gcc 12 is wrong about strings that are put together in an expression, as tests do; the clang builds have no such doubt.
+    target_compile_options(zor_${area}_tests PRIVATE
+        $<$<CXX_COMPILER_ID:GNU>:-Wno-array-bounds -Wno-restrict -Wno-maybe-uninitialized -Wno-stringop-overflow>)
     zor_use_pch(zor_${area}_tests)
     target_include_directories(zor_${area}_tests PRIVATE ${CMAKE_SOURCE_DIR}/tests)
     target_compile_definitions(zor_${area}_tests PRIVATE ZORVANE_SOURCE_DIR="${CMAKE_SOURCE_DIR}"
