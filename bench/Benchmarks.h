@@ -1,0 +1,25 @@
+// SPDX-License-Identifier: Apache-2.0
+// The groups of figures. Each makes what it needs in a place of its own, and leaves nothing behind. Main thread.
+#pragma once
+
+#include "Daemon.h"
+#include "Report.h"
+
+#include <vector>
+
+namespace zor::bench {
+
+/// One client asks for a container that is there: LookupBench.cc.
+std::vector<Figure> measureLookup(const Settings& settings);
+/// Many do: ThroughputBench.cc.
+std::vector<Figure> measureThroughput(const Settings& settings);
+/// Containers are made: CreateBench.cc.
+std::vector<Figure> measureCreate(const Settings& settings);
+/// The first look into a class with many containers: ClassBench.cc.
+std::vector<Figure> measureClass(const Settings& settings);
+/// What the daemon costs when nobody asks, and until it answers: LifeBench.cc.
+std::vector<Figure> measureStart(const Settings& settings);
+/// What it costs after it was asked very often: LifeBench.cc.
+std::vector<Figure> measureEndurance(const Settings& settings);
+
+} // namespace zor::bench

@@ -1,0 +1,132 @@
+// SPDX-License-Identifier: Apache-2.0
+// The first lookup in a class, which reads all of its containers, against a loop that reads the same files and forgets
+// them: from memory, from the disk, and what a record costs the daemon in memory. The containers are written by this
+// program.
+#include "Benchmarks.h"
+#include "ClassTree.h"
+
+#include <memory>
+
+namespace zor::bench {
+
+namespace {
+
+constexpr ContainerClass large = ContainerClass::dataApplication;
+constexpr ContainerClass small = ContainerClass::dataKolvexPlugin;
+constexpr ContainerClass other = ContainerClass::dataVPNPlugin; // empty: warms up all else
+
+struct FirstLookup {
+    double seconds = 0;
+    double grownKiB = 0;
+};
+
+enum class Caches { warm, cold };
+
+/// A daemon that has read nothing yet is asked for one container of the class.
+FirstLookup firstLookup(const Settings& settings, const Place& place, ContainerClass containerClass, Caches caches) {
+    const Daemon daemon(settings, place.path(), {});
+    Client client = daemon.connect();
+    (void)client.exchange(containerRequest("com.example.none", other, Create::no));
+    const Frame request = containerRequest(ClassTree::identifier(0), containerClass, Create::no);
+    if (caches == Caches::cold && !dropCaches(place.path()))
+        throw Failure("the caches cannot be dropped");
+    const double before = daemon.residentKiB();
+    const auto begin = Clock::now();
+    const auto reply = client.exchange(request);
+    const double seconds = secondsSince(begin);
+    mustSucceed(reply, true);
+    return {.seconds = seconds, .grownKiB = daemon.residentKiB() - before};
+}
+
+struct Warm {
+    Pairs seconds;                    // of the large class
+    std::vector<double> smallSeconds; // measured next to them
+    std::vector<double> grownKiB;
+    std::vector<double> growth; // per entry, large by small
+};
+
+Warm measureWarm(const Settings& settings, const Place& place, const ClassTree& tree, const ClassTree& smallTree) {
+    Warm warm;
+    (void)tree.readAll();
+    (void)smallTree.readAll();
+    for (int round = 0; round < settings.rounds(7, 3); ++round) {
+        const FirstLookup lookup = firstLookup(settings, place, large, Caches::warm);
+        const FirstLookup smallLookup = firstLookup(settings, place, small, Caches::warm);
+        warm.seconds.measured.push_back(lookup.seconds);
+        warm.seconds.floor.push_back(tree.readAll());
+        warm.smallSeconds.push_back(smallLookup.seconds);
+        warm.grownKiB.push_back(lookup.grownKiB);
+        warm.growth.push_back(lookup.seconds / tree.count() / (smallLookup.seconds / smallTree.count()));
+    }
+    return warm;
+}
+
+Figure coldFigure(const Settings& settings, const Place& place, const ClassTree& tree) {
+    Figure figure = {.name = "class.cold",
+                     .what = text("first lookup in a class of %d, from the disk", tree.count()),
+                     .measured = "",
+                     .floor = "",
+                     .unit = "x",
+                     .goal = 0.6};
+    if (!dropCaches(place.path())) {
+        figure.remark = "only root may drop the kernel's caches";
+        return figure;
+    }
+    Pairs pairs;
+    for (int round = 0; round < 1; ++round) {
+        pairs.measured.push_back(firstLookup(settings, place, large, Caches::cold).seconds);
+        dropCaches(place.path());
+        pairs.floor.push_back(tree.readAll());
+    }
+    figure.measured = text("%.2f s", pairs.measuredMedian());
+    figure.floor = text("%.2f s", pairs.floorMedian());
+    figure.value = pairs.ratio();
+    figure.numbers = {{"seconds", pairs.measuredMedian()}, {"floorSeconds", pairs.floorMedian()}};
+    return figure;
+}
+
+} // namespace
+
+std::vector<Figure> measureClass(const Settings& settings) {
+    const int count = settings.rounds(100'000, 20'000);
+    const Place place(*settings.scratch, "class", {.bytes = std::uint64_t{3} << 30, .inodes = 300'000});
+    prepareRoot(settings, place.path());
+    const ClassTree tree(makeClassDirectory(place.path(), large), large, count);
+    const ClassTree smallTree(makeClassDirectory(place.path(), small), small, count / 10);
+    firstLookup(settings, place, small, Caches::warm); // its launch is the first after the boot and looks at everything
+    const Warm warm = measureWarm(settings, place, tree, smallTree);
+    const double measured = warm.seconds.measuredMedian();
+    const double perRecord = median(warm.grownKiB) * 1024 / count;
+    return {
+        {.name = "class.warm",
+         .what = text("first lookup in a class of %d, warm", count),
+         .measured = text("%.0f ms", measured * 1e3),
+         .floor = text("%.0f ms", warm.seconds.floorMedian() * 1e3),
+         .value = warm.seconds.ratio(),
+         .unit = "x",
+         .goal = 2.0,
+         .remark = text("%.2f us for each container, of the floor %.2f; on ", measured * 1e6 / count,
+                        warm.seconds.floorMedian() * 1e6 / count) +
+                   place.description(),
+         .numbers = {{"seconds", measured}, {"floorSeconds", warm.seconds.floorMedian()}}},
+        {.name = "class.linear",
+         .what = text("each container, of %d by of %d", count, smallTree.count()),
+         .measured = text("%.2f us", measured * 1e6 / count),
+         .floor = text("%.2f us", median(warm.smallSeconds) * 1e6 / smallTree.count()),
+         .value = median(warm.growth),
+         .unit = "x",
+         .goal = 1.2,
+         .numbers = {{"secondsOfSmall", median(warm.smallSeconds)}}},
+        coldFigure(settings, place, tree),
+        {.name = "class.memory",
+         .what = text("memory of each of %d records", count),
+         .measured = text("%.1f MiB", median(warm.grownKiB) / 1024),
+         .floor = text("%zu bytes", ClassTree::recordDataBytes),
+         .value = perRecord,
+         .unit = "bytes",
+         .goal = 300,
+         .remark = "growth of the resident memory by the first lookup; the floor is what is known of each container",
+         .numbers = {{"bytes", perRecord}}}};
+}
+
+} // namespace zor::bench

@@ -1,0 +1,106 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "Client.h"
+
+#include "Processes.h"
+#include "ipc/Frame.h"
+#include "ipc/Keys.h"
+#include "plist/Binary.h"
+
+#include <cerrno>
+#include <cstring>
+#include <fcntl.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+
+namespace zor::bench {
+
+using platform::FileDescriptor;
+
+namespace {
+
+constexpr std::size_t bufferBytes = std::size_t{64} * 1024; // more than any reply here
+constexpr std::uint64_t requestId = 1;
+
+} // namespace
+
+Frame containerRequest(const std::string& identifier, ContainerClass containerClass, Create create) {
+    plist::Dictionary request{
+        {std::string(ipc::keys::command), static_cast<std::uint64_t>(ipc::Command::createOrLookupContainer)},
+        {std::string(ipc::keys::containerClass), static_cast<std::uint64_t>(containerClass)},
+        {std::string(ipc::keys::userId), userId},
+        {std::string(ipc::keys::identifier), identifier},
+    };
+    if (create == Create::yes)
+        request.set(ipc::keys::createIfNecessary, true);
+    Frame frame(ipc::frameHeaderBytes);
+    if (!plist::appendBinary(request, frame))
+        throw Failure("a request cannot be written");
+    const ipc::FrameHeader header = {.payloadBytes = static_cast<std::uint32_t>(frame.size() - ipc::frameHeaderBytes),
+                                     .flags = ipc::frameExpectsReply,
+                                     .id = requestId};
+    ipc::encodeFrameHeader(header, std::span(frame).first<ipc::frameHeaderBytes>());
+    return frame;
+}
+
+Client::Client(const std::string& directory, std::string_view name)
+    : socket_(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)), buffer_(bufferBytes) {
+    const FileDescriptor opened(::open(directory.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    // A socket's address is short; a directory's path may be longer.
+    const std::string path = "/proc/self/fd/" + std::to_string(opened.get()) + "/" + std::string(name);
+    sockaddr_un address{};
+    if (!socket_.valid() || !opened.valid() || path.size() >= sizeof address.sun_path)
+        throw Failure("no way to a socket in " + directory);
+    address.sun_family = AF_UNIX;
+    std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
+    if (::connect(socket_.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0)
+        failWithErrno("connect to " + std::string(name));
+}
+
+void Client::send(std::span<const std::uint8_t> frame) {
+    while (!frame.empty()) {
+        const ssize_t sent = ::send(socket_.get(), frame.data(), frame.size(), MSG_NOSIGNAL);
+        if (sent < 0 && errno != EINTR)
+            failWithErrno("send");
+        if (sent > 0)
+            frame = frame.subspan(static_cast<std::size_t>(sent));
+    }
+}
+
+std::span<const std::uint8_t> Client::receive() {
+    std::size_t filled = 0;
+    std::size_t wanted = ipc::frameHeaderBytes;
+    while (filled < wanted) {
+        const ssize_t received = ::recv(socket_.get(), buffer_.data() + filled, buffer_.size() - filled, 0);
+        if (received == 0)
+            throw Failure("the connection was ended by the other side");
+        if (received < 0 && errno != EINTR)
+            failWithErrno("recv");
+        filled += received > 0 ? static_cast<std::size_t>(received) : 0;
+        if (filled < ipc::frameHeaderBytes)
+            continue;
+        wanted = ipc::frameHeaderBytes +
+                 ipc::decodeFrameHeader(std::span(buffer_).first<ipc::frameHeaderBytes>()).payloadBytes;
+        if (wanted > buffer_.size())
+            throw Failure("a reply is too long");
+    }
+    return std::span(buffer_).first(wanted);
+}
+
+plist::Dictionary replyOf(std::span<const std::uint8_t> frame) {
+    const auto value = plist::readBinary(frame.subspan(ipc::frameHeaderBytes));
+    const plist::Dictionary* reply = value ? value->asDictionary() : nullptr;
+    if (!reply)
+        throw Failure("a reply is no dictionary");
+    return *reply;
+}
+
+void mustSucceed(std::span<const std::uint8_t> frame, bool existed) {
+    const plist::Dictionary reply = replyOf(frame);
+    if (reply.unsignedInteger(ipc::keys::replyError) == ipc::replySuccess &&
+        reply.isTrue(ipc::keys::replyExisted) == existed)
+        return;
+    const plist::Value value(reply);
+    throw Failure("unexpected reply: " + plist::describe(&value));
+}
+
+} // namespace zor::bench

@@ -1,0 +1,50 @@
+// SPDX-License-Identifier: Apache-2.0
+// The least that a client of the daemon needs: requests as bytes made beforehand, and one round trip at a time. The
+// client of the floor is the same, so that what it costs is on both sides of a ratio.
+#pragma once
+
+#include "daemon/base/ContainerClass.h"
+#include "platform/FileDescriptor.h"
+#include "plist/Value.h"
+
+#include <cstdint>
+#include <span>
+#include <string>
+#include <vector>
+
+namespace zor::bench {
+
+using Frame = std::vector<std::uint8_t>;
+
+/// The user of all containers here.
+constexpr std::uint32_t userId = 501;
+
+enum class Create { no, yes };
+/// A whole frame: find the container, or make it.
+[[nodiscard]] Frame containerRequest(const std::string& identifier, ContainerClass containerClass, Create create);
+
+class Client {
+public:
+    /// Connects to the socket `name` in a directory. A failure when nobody listens.
+    Client(const std::string& directory, std::string_view name);
+
+    [[nodiscard]] int descriptor() const { return socket_.get(); }
+    void send(std::span<const std::uint8_t> frame);
+    /// The next whole frame; valid until the next call.
+    std::span<const std::uint8_t> receive();
+    std::span<const std::uint8_t> exchange(std::span<const std::uint8_t> frame) {
+        send(frame);
+        return receive();
+    }
+
+private:
+    platform::FileDescriptor socket_;
+    Frame buffer_;
+};
+
+/// The dictionary in a reply frame.
+[[nodiscard]] plist::Dictionary replyOf(std::span<const std::uint8_t> frame);
+/// A failure unless the reply says that the command did what it was asked, on a container that was there or not.
+void mustSucceed(std::span<const std::uint8_t> frame, bool existed);
+
+} // namespace zor::bench
