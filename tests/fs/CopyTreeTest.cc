@@ -451,8 +451,9 @@ TEST(CopyTree, TakesNothingFromOutside) {
             for (; std::chrono::steady_clock::now() < end; ++copies) {
                 // A single file is copied so often that its change into a FIFO falls between the look and the opening.
                 std::string source = "tree/wide/f" + std::to_string(copies % World::wideCount);
-                if (copies % 50 < 4)
+                if (copies % 50 < 4) {
                     source = copies % 50 == 0 ? "tree" : "tree/wide";
+                }
                 copyTree(world.disk, world.fd(), source.c_str(), world.fd(), ".copy");
                 if (!exists(world.fd(), ".copy"))
                     continue;
