@@ -4,6 +4,7 @@
 #include "entitlements/ZOREntitlementMapping.h"
 #include "fs/AtomicFile.h"
 #include "fs/DictionaryFile.h"
+#include "fs/RecursiveRemove.h"
 #include "platform/linux/FileDeviceLockState.h"
 #include "platform/linux/LinuxDisk.h"
 #include "platform/linux/LinuxPasswordDatabase.h"
@@ -13,6 +14,7 @@
 
 #include <algorithm>
 #include <cstdlib>
+#include <fcntl.h>
 #include <optional>
 #include <string>
 #include <sys/stat.h>
@@ -45,7 +47,11 @@ public:
         file_ = FileURL::file(library_ + "/" + names::entitlementFile);
         configuration_.libraryDirectory();
     }
-    ~Device() { (void)fileManager_.removeItemAtURL(FileURL::directory(root_.path("/private"))); }
+    ~Device() {
+        const platform::FileDescriptor parent(::open("/dev/shm", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+        const std::string& path = root_.canonicalPath();
+        (void)fs::removeTree(disk_, parent.get(), path.c_str() + path.rfind('/') + 1);
+    }
     Device(const Device&) = delete;
     Device& operator=(const Device&) = delete;
 
