@@ -457,9 +457,10 @@ TEST(CopyTree, TakesNothingFromOutside) {
                 copyTree(world.disk, world.fd(), source.c_str(), world.fd(), ".copy");
                 if (!exists(world.fd(), ".copy"))
                     continue;
-                if (copies % 50 < 4)
+                if (copies % 50 < 4) {
                     for (const auto& [id, inode] : support::readTree(world.path() + "/.copy").inodes)
                         ASSERT_NE(std::string(inode.content.begin(), inode.content.end()), World::secret);
+                }
                 ASSERT_EQ(removeTree(world.disk, world.fd(), ".copy"), 0);
             }
         }
