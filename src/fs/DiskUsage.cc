@@ -30,21 +30,30 @@ constexpr std::size_t queuedBytesMax = 16 * 1024 * 1024;
 constexpr std::uint64_t blockBytes = 512;
 constexpr std::uint32_t xfsMagic = 0x58465342;
 
-/// The greatest size that a directory without entries has, on file systems whose directories with entries are all
-/// larger. There a status tells what would else take an open and a read.
-std::optional<off_t> emptyDirectoryBytes(int directory) {
+/// What the type of the tree's file system tells.
+struct FileSystemTraits {
+    /// The greatest size that a directory without entries has, where every directory with entries is larger. There a
+    /// status tells what would else take an open and a read.
+    std::optional<off_t> emptyDirectoryBytes;
+    /// Whether a part of it can have another device number without a mount point.
+    bool hasSubvolumes = true;
+};
+
+FileSystemTraits traitsOf(int directory) {
     struct statfs status{};
     if (::fstatfs(directory, &status) != 0)
-        return std::nullopt;
+        return {};
     switch (static_cast<std::uint32_t>(status.f_type)) {
     case BTRFS_SUPER_MAGIC:
-        return 0;
+        return {.emptyDirectoryBytes = 0};
     case xfsMagic:
-        return 10;
+        return {.emptyDirectoryBytes = 10, .hasSubvolumes = false};
     case TMPFS_MAGIC:
-        return 40;
+        return {.emptyDirectoryBytes = 40, .hasSubvolumes = false};
+    case EXT4_SUPER_MAGIC:
+        return {.hasSubvolumes = false};
     default:
-        return std::nullopt;
+        return {};
     }
 }
 
@@ -55,13 +64,14 @@ std::string joined(const std::string& path, const char* name) {
 class Measurement {
 public:
     Measurement(int root, const std::string& rootPath, const UsageLog& log)
-        : root_(root), rootPath_(rootPath), log_(log), emptyBytes_(emptyDirectoryBytes(root)) {}
+        : root_(root), rootPath_(rootPath), log_(log), traits_(traitsOf(root)) {}
 
     std::uint64_t run();
 
 private:
     void measureDirectory(const std::string& path);
     void measureEntries(int directory, const std::string& path);
+    [[nodiscard]] bool isInTree(int directory) const;
     void addDirectory(int directory, const std::string& path, const char* name);
     /// `makePath` is called only for a message.
     template <typename MakePath>
@@ -80,7 +90,7 @@ private:
     const int root_;
     const std::string& rootPath_;
     const UsageLog& log_;
-    const std::optional<off_t> emptyBytes_;
+    const FileSystemTraits traits_;
     dev_t device_ = 0;
     std::uint64_t total_ = 0;
     std::unordered_set<ino_t> seen_;
@@ -119,9 +129,13 @@ void Measurement::measureDirectory(const std::string& path) {
             sayUnopened(path, directory.error());
         return;
     }
-    struct stat status{};
-    if (::fstat(directory->get(), &status) == 0 && status.st_dev == device_)
+    if (isInTree(directory->get()))
         measureEntries(directory->get(), path);
+}
+
+bool Measurement::isInTree(int directory) const {
+    struct stat status{};
+    return !traits_.hasSubvolumes || (::fstat(directory, &status) == 0 && status.st_dev == device_);
 }
 
 void Measurement::measureEntries(int directory, const std::string& path) {
@@ -129,7 +143,7 @@ void Measurement::measureEntries(int directory, const std::string& path) {
     std::uint64_t index = 0;
     for (; const BulkDirectoryRead::Entry* entry = entries.next(); ++index) {
         struct stat status{};
-        if (entry->type == DT_DIR && !emptyBytes_) {
+        if (entry->type == DT_DIR && !traits_.emptyDirectoryBytes) {
             addDirectory(directory, path, entry->name);
         } else if (::fstatat(directory, entry->name, &status, AT_SYMLINK_NOFOLLOW) != 0) {
             sayUnexamined(path, index, errno);
@@ -137,9 +151,8 @@ void Measurement::measureEntries(int directory, const std::string& path) {
             continue;
         } else if (!S_ISDIR(status.st_mode)) {
             addNonDirectory(status, [&] { return joined(path, entry->name); });
-        } else if (emptyBytes_ && status.st_size <= *emptyBytes_) {
-            if (logs(logLevelDebug))
-                sayEmpty(joined(path, entry->name));
+        } else if (traits_.emptyDirectoryBytes && status.st_size <= *traits_.emptyDirectoryBytes) {
+            sayEmpty(joined(path, entry->name));
         } else {
             addDirectory(directory, path, entry->name);
         }
@@ -149,7 +162,7 @@ void Measurement::measureEntries(int directory, const std::string& path) {
                    formatted("scanbatch on entry %llu in %s returned error %s", static_cast<unsigned long long>(index),
                              ZOR_SHOWN(fullPath(path)), errorText(entries.error())));
     // Where only the reading tells that there is nothing, this is when it is known.
-    if (index == 0 && entries.error() == 0 && !path.empty() && logs(logLevelDebug))
+    if (index == 0 && entries.error() == 0 && !path.empty())
         sayEmpty(path);
 }
 
@@ -175,13 +188,12 @@ void Measurement::addNonDirectory(const struct stat& status, MakePath makePath) 
 void Measurement::measureDepthFirst(int parent, const std::string& path, const char* name) {
     const std::string top = joined(path, name);
     const auto directory = platform::openBeneathOnMount(parent, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
-    struct stat status{};
     if (!directory) {
         if (directory.error() != EXDEV)
             sayUnopened(top, directory.error());
         return;
     }
-    if (::fstat(directory->get(), &status) != 0 || status.st_dev != device_)
+    if (!isInTree(directory->get()))
         return;
     TreeWalker walker(WalkStatus::full);
     const int result = walker.walk(directory->get(), ".", [&](const WalkEntry& entry) {
@@ -226,7 +238,8 @@ void Measurement::sayUnexamined(const std::string& path, std::uint64_t index, in
 }
 
 void Measurement::sayEmpty(const std::string& path) const {
-    log_.write(logLevelDebug, formatted("skipping empty directory at %s", ZOR_SHOWN(fullPath(path))));
+    if (logs(logLevelDebug))
+        log_.write(logLevelDebug, formatted("skipping empty directory at %s", ZOR_SHOWN(fullPath(path))));
 }
 
 } // namespace

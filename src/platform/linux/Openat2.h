@@ -15,10 +15,12 @@ namespace zor::platform {
 [[nodiscard]] std::expected<FileDescriptor, int> openBeneath(int directory, const char* relativePath, int flags,
                                                              mode_t mode = 0);
 
-/// The same, and no mount point is crossed, not even one of the same file system: EXDEV. What is mounted there is not asked.
+/// The same, and no mount point is crossed, not even one of the same file system: EXDEV. What is mounted there is not
+/// asked. A ".." is refused even where it stays inside.
 [[nodiscard]] std::expected<FileDescriptor, int> openBeneathOnMount(int directory, const char* relativePath, int flags);
 
-/// The same as openBeneath for trees that only root writes to, such as DIR/etc: links are followed, as if `directory` were "/".
+/// The same as openBeneath for trees that only root writes to, such as DIR/etc: links are followed, as if `directory`
+/// were "/".
 [[nodiscard]] std::expected<FileDescriptor, int> openInRoot(int directory, const char* relativePath, int flags);
 
 } // namespace zor::platform
