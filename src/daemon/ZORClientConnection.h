@@ -109,6 +109,7 @@ private:
     bool isOrphan(const FileURL& entry, ContainerClass containerClass);
     void reportOrphan(const FileURL& entry);
     void sweepStaging();
+    void makeDirectoriesDurable();
 
     StoreServices& services_;
     Client client_;

@@ -100,9 +100,10 @@ Result<void> ZOREntitlementMapping::_setEntitlementDictionaryValues(const std::v
         }
         changed = true;
     }
-    if (!changed)
+    if (!changed && !unsaved_)
         return {};
     auto written = _writeEntitlementMappingToDisk();
+    unsaved_ = !written;
     if (!written)
         log_.write(logLevelError, __func__, "Error writing entitlement mappings to disk after set : %s",
                    written.error().text().c_str());

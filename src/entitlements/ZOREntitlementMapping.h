@@ -56,7 +56,8 @@ public:
         ZOR_EXCLUDES(entitlementQueue_);
 
     /// Stores a value under each key (an empty dictionary removes the key) and saves once, when anything changed. Error 60
-    /// when the counts differ, 59 when the save fails: the map in memory then keeps the change.
+    /// when the counts differ, 59 when the save fails: the map in memory then keeps the change, and the next call saves it
+    /// even when it changes nothing.
     Result<void> _setEntitlementDictionaryValues(const std::vector<plist::Dictionary>& values,
                                                  const std::vector<std::string>& identifiers)
         ZOR_EXCLUDES(entitlementQueue_);
@@ -92,6 +93,8 @@ private:
     const FileURL entitlementMappingFileUrl_;
     platform::Mutex entitlementQueue_;
     plist::Dictionary entitlementMappingDict_ ZOR_GUARDED_BY(entitlementQueue_);
+    /// The last save failed: the map is ahead of the file, and no change may be answered with success before one succeeds.
+    bool unsaved_ ZOR_GUARDED_BY(entitlementQueue_) = false;
 };
 
 } // namespace zor

@@ -74,6 +74,10 @@ int Durability::beforeMove(int file) const {
     return ordering(file) == Ordering::journal ? disk_.orderData(file) : disk_.syncFileSystem(file);
 }
 
+int Durability::beforeRemoval(int directory) const {
+    return ordering(directory) == Ordering::journal ? 0 : disk_.syncFileSystem(directory);
+}
+
 int Durability::afterMove(int directory) const {
     return ordering(directory) == Ordering::journal ? disk_.sync(directory) : disk_.syncFileSystem(directory);
 }

@@ -35,6 +35,9 @@ public:
     /// Before a tree of new directories and small new files is moved into view. `file` is a new file in the tree whose data
     /// counts. 0 or a negative errno.
     [[nodiscard]] int beforeMove(int file) const;
+    /// After things were moved to a directory to be removed there, before they are: else a cut could leave the removal and
+    /// undo the move. 0 or a negative errno.
+    [[nodiscard]] int beforeRemoval(int directory) const;
     /// After the move, before it is acknowledged; needs no lock. `directory` is where the name came to be.
     [[nodiscard]] int afterMove(int directory) const;
 

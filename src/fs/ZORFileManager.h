@@ -7,7 +7,7 @@
 // returns them to a client logs.
 //
 // What a stop in the middle leaves: of a new directory, a sibling named "NAME.XXXXXX"; of a move across file systems, a
-// hidden ".zorvaned-copy-XXXXXX" beside the destination, and the source. Neither is ever taken for the real thing.
+// hidden ".zorvaned-copy-XXXXXX" beside the destination or where the source was. Neither is ever taken for the real thing.
 #pragma once
 
 #include "daemon/base/FileURL.h"
@@ -71,7 +71,7 @@ public:
     Result<void> standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid);
     /// The entries whose names do not begin with ".", in the directory's order.
     Result<std::vector<FileURL>> urlsForItemsInDirectoryAtURL(const FileURL& directory);
-    /// What copies across file systems that were cut short left in a directory. Empty when it cannot be read.
+    /// What moves across file systems that were cut short left in a directory. Empty when it cannot be read.
     std::vector<FileURL> copyLeftoversInDirectoryAtURL(const FileURL& directory);
     /// To the log, one line an entry.
     void printDirectoryStructureAtURL(const FileURL& url);
@@ -99,6 +99,8 @@ private:
     Result<void> _copyItemAtURL(const FileURL& source, const FileURL& destination, MissingSource missing);
     Result<void> _moveItemAtURL(const FileURL& source, const FileURL& destination, MissingSource missing);
     Result<void> moveAcrossFileSystems(const FileURL& source, const FileURL& destination);
+    /// 0 or a negative errno: the source then has its name still, or is a hidden leftover.
+    int removeMovedSource(const FileURL& source, const FileURL& destination);
     Result<bool> sourceIsMissing(const FileURL& source);
     /// Copies beside the destination and renames, so that a partial copy never has the final name.
     Result<void> copyTree(const FileURL& source, const FileURL& destination);

@@ -150,11 +150,29 @@ Result<void> ZORFileManager::_moveItemAtURL(const FileURL& source, const FileURL
 
 Result<void> ZORFileManager::moveAcrossFileSystems(const FileURL& source, const FileURL& destination) {
     TRY(copyTree(source, destination));
-    const auto from = resolver_.openParent(source);
-    const int removed = from ? fs::removeTree(disk_, from->directory.get(), from->name.c_str()) : -from.error();
+    const int removed = removeMovedSource(source, destination);
     if (removed < 0)
         log_.write(logLevelError, __func__, "Failed to remove source %s : %s", source.c_str(), errorText(-removed));
     return {};
+}
+
+int ZORFileManager::removeMovedSource(const FileURL& source, const FileURL& destination) {
+    const auto syncParent = [this](const FileURL& url) {
+        const auto directory = resolver_.openDirectory(url.deletingLastPathComponent());
+        return directory ? disk_.sync(directory->get()) : -directory.error();
+    };
+    const auto from = resolver_.openParent(source);
+    if (!from)
+        return -from.error();
+    const int directory = from->directory.get();
+    const std::string hidden = fs::uniqueName(copyPrefix);
+    // The source leaves its name in one step, when the copy cannot lose its own any more; only then it is taken apart.
+    int status = syncParent(destination);
+    if (status == 0)
+        status = disk_.rename(directory, from->name.c_str(), directory, hidden.c_str(), 0);
+    if (status == 0)
+        status = syncParent(source);
+    return status < 0 ? status : fs::removeTree(disk_, directory, hidden.c_str());
 }
 
 Result<void> ZORFileManager::_traverseDirectory(const FileURL& url,

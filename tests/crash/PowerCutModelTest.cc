@@ -78,6 +78,11 @@ const std::vector<Protocol> protocols = {
      newMode,
      false,
      false},
+    {"data ordered out before it is written",
+     {Step::createTemporary, Step::orderFile, Step::writeNew, Step::renameOver, Step::syncDirectory},
+     newMode,
+     false,
+     false},
     {"written in place", {Step::createInPlace, Step::writeNew, Step::syncFile}, newMode, false, false},
     {"old one unlinked first",
      {Step::createTemporary, Step::writeNew, Step::syncFile, Step::unlinkOld, Step::renameOver, Step::syncDirectory},
@@ -218,6 +223,49 @@ TEST(PowerCutDirectoryTest, TellsSoundFromWrong) {
         EXPECT_EQ(ordered.complaint.empty(), protocol.soundOrdered) << ordered.complaint;
         const LoopReport unordered = forEachPowerCut(log, {.model = DiskModel::unordered}, judgeDirectory);
         EXPECT_EQ(unordered.complaint.empty(), protocol.soundUnordered) << unordered.complaint;
+    }
+}
+
+// Goal: what moves on from directory to directory is in one of them, whichever moves a cut loses. Method: a file and a
+// directory moved twice, with one sync of the last destination.
+TEST(PowerCutDirectoryTest, MovesOneStepAfterTheOther) {
+    const TemporaryDirectory root;
+    const FileDescriptor top = openBelow(root.path());
+    LinuxDisk linuxDisk;
+    RecordingDisk disk(linuxDisk, root.path());
+    for (const char* name : {"a", "b", "c", "a/d"})
+        ASSERT_EQ(::mkdirat(top.get(), name, 0755), 0);
+    makeFile(top.get(), "a/f", oldContent, newMode);
+    disk.start();
+    const FileDescriptor a = openBelow(root.path() + "/a");
+    const FileDescriptor b = openBelow(root.path() + "/b");
+    const FileDescriptor c = openBelow(root.path() + "/c");
+    for (const char* name : {"f", "d"}) {
+        ASSERT_EQ(disk.rename(a.get(), name, b.get(), name, 0), 0);
+        ASSERT_EQ(disk.rename(b.get(), name, c.get(), name, 0), 0);
+    }
+    ASSERT_EQ(disk.sync(c.get()), 0);
+    ASSERT_EQ(disk.complaint(), "");
+    const DiskLog log = disk.log();
+    for (const DiskModel model : {DiskModel::orderedJournal, DiskModel::unordered}) {
+        std::set<std::string> places;
+        const LoopReport report = forEachPowerCut(
+            log, {.model = model}, [&](const PowerCutState& state, const std::string& directory) -> std::string {
+                const FileTree tree = readTree(directory);
+                for (const char* name : {"f", "d"}) {
+                    std::string place;
+                    for (const char* parent : {"a/", "b/", "c/"})
+                        place += tree.resolve(std::string(parent) + name) != 0 ? parent : "";
+                    if (place.size() != 2)
+                        return std::string(name) + " is in \"" + place + "\"";
+                    if (state.operationsDone == log.operations.size() && place != "c/")
+                        return std::string(name) + " was synced in c and is in " + place;
+                    places.insert(place + name);
+                }
+                return "";
+            });
+        EXPECT_EQ(report.complaint, "");
+        EXPECT_EQ(places.size(), 6U) << "each was seen in each place";
     }
 }
 

@@ -71,22 +71,22 @@ std::map<std::string, Bytes> readAttributes(int fd) {
     return attributes;
 }
 
-std::vector<std::string> listNames(int directory) {
+std::vector<std::string> listNames(DIR* stream) {
     std::vector<std::string> names;
-    const int again = ::openat(directory, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (again < 0)
-        fail("open .");
-    const std::unique_ptr<DIR, int (*)(DIR*)> stream(::fdopendir(again), ::closedir);
     errno = 0;
-    while (const dirent* entry = ::readdir(stream.get())) {
-        const std::string name = entry->d_name;
+    while (const dirent* entry = ::readdir(stream)) {
+        const std::string_view name = entry->d_name;
         if (name != "." && name != "..")
-            names.push_back(name);
+            names.emplace_back(name);
     }
     if (errno != 0)
         fail("readdir");
     std::sort(names.begin(), names.end());
     return names;
+}
+
+Inode inodeOf(const struct stat& status) {
+    return {.mode = status.st_mode, .uid = status.st_uid, .gid = status.st_gid, .device = status.st_dev};
 }
 
 std::string joined(const std::string& path, const std::string& name) {
@@ -204,7 +204,7 @@ Inode readInode(int directory, const char* name) {
     struct stat status = {};
     if (::fstatat(directory, name, &status, AT_SYMLINK_NOFOLLOW) != 0)
         fail(std::string("stat ") + name);
-    Inode inode{.mode = status.st_mode, .uid = status.st_uid, .gid = status.st_gid};
+    Inode inode = inodeOf(status);
     if (S_ISLNK(status.st_mode)) {
         char target[4096];
         const ssize_t length = ::readlinkat(directory, name, target, sizeof target);
@@ -233,20 +233,23 @@ FileTree readTree(const std::string& directory, const std::set<std::string>& exc
         if (::fstatat(parent, name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0)
             fail("stat " + name);
         const auto [id, isNew] = ids.emplace(DeviceInode(status.st_dev, status.st_ino), next);
+        // A directory is opened once, below.
         if (isNew)
-            tree.inodes.emplace(next++, readInode(parent, name.c_str()));
+            tree.inodes.emplace(next++, S_ISDIR(status.st_mode) ? inodeOf(status) : readInode(parent, name.c_str()));
         return id->second;
     };
     std::vector<std::pair<std::string, InodeId>> pending = {{"", add(root.get(), ".")}};
     while (!pending.empty()) {
         const auto [path, id] = pending.back();
         pending.pop_back();
-        const FileDescriptor fd = openDirectory(root.get(), path.empty() ? "." : path);
-        for (const std::string& name : listNames(fd.get())) {
+        FileDescriptor fd = openDirectory(root.get(), path.empty() ? "." : path);
+        tree.inodes.at(id).attributes = readAttributes(fd.get());
+        const std::unique_ptr<DIR, int (*)(DIR*)> stream(::fdopendir(fd.release()), ::closedir);
+        for (const std::string& name : listNames(stream.get())) {
             const std::string itemPath = joined(path, name);
             if (excluded.contains(itemPath))
                 continue;
-            const InodeId child = add(fd.get(), name);
+            const InodeId child = add(::dirfd(stream.get()), name);
             tree.inodes.at(id).entries.emplace(name, child);
             if (tree.inodes.at(child).isDirectory())
                 pending.emplace_back(itemPath, child);

@@ -30,6 +30,8 @@ struct Inode {
     mode_t mode = 0;
     uid_t uid = 0;
     gid_t gid = 0;
+    /// The file system that it was made on; not part of what the tree is.
+    dev_t device = 0;
     /// Of a regular file its bytes, of a symbolic link its target.
     Bytes content;
     std::map<std::string, Bytes> attributes;

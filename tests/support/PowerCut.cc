@@ -2,14 +2,10 @@
 #include "support/PowerCut.h"
 
 #include <algorithm>
-#include <random>
 
 namespace zor::support {
 
 namespace {
-
-/// More uncertain changes than this are not lost or kept one by one; the seeded choice has to do.
-constexpr std::size_t singleChangesMax = 24;
 
 std::string describeLog(const DiskLog& log, std::size_t done) {
     std::string text;
@@ -25,6 +21,7 @@ PowerCut::PowerCut(const DiskLog& log, const PowerCutOptions& options) : log_(lo
     for (std::size_t i = 0; i < log_.operations.size(); ++i) {
         const LoggedOperation& operation = log_.operations[i];
         startedFrom_.emplace_back();
+        devices_.insert(operation.device);
         if (!operation.changesNames())
             continue;
         const auto take = [&](InodeId directory, const std::string& name) {
@@ -38,10 +35,12 @@ PowerCut::PowerCut(const DiskLog& log, const PowerCutOptions& options) : log_(lo
     }
 }
 
-std::size_t PowerCut::committedPrefix(std::size_t done) const {
+std::size_t PowerCut::committedPrefix(std::size_t done, dev_t device) const {
     std::size_t prefix = 0;
     for (std::size_t s = 0; s < done; ++s) {
         const LoggedOperation& operation = log_.operations[s];
+        if (operation.device != device)
+            continue;
         if (operation.call == DiskCall::syncFileSystem)
             prefix = s;
         if (operation.call != DiskCall::sync)
@@ -54,11 +53,54 @@ std::size_t PowerCut::committedPrefix(std::size_t done) const {
     return prefix;
 }
 
+std::vector<std::size_t> PowerCut::possiblePrefixes(std::size_t done, dev_t device) const {
+    std::vector<std::size_t> prefixes = {committedPrefix(done, device)};
+    for (std::size_t i = prefixes.front(); i < done; ++i) {
+        const LoggedOperation& operation = log_.operations[i];
+        const bool counts =
+            operation.changesNames() || operation.changesInode() || operation.call == DiskCall::orderData;
+        if (counts && operation.device == device)
+            prefixes.push_back(i + 1);
+    }
+    return prefixes;
+}
+
+std::vector<PowerCut::Prefixes> PowerCut::prefixesToTry(std::size_t done, std::mt19937_64& random) const {
+    std::map<dev_t, std::vector<std::size_t>> possible;
+    Prefixes least;
+    Prefixes most;
+    for (const dev_t device : devices_) {
+        possible[device] = possiblePrefixes(done, device);
+        least[device] = possible[device].front();
+        most[device] = possible[device].back();
+    }
+    std::vector<Prefixes> tried = {least, most};
+    for (auto [device, prefixes] : possible) {
+        std::shuffle(prefixes.begin(), prefixes.end(), random);
+        prefixes.resize(std::min(prefixes.size(), options_.singleChangesMax));
+        for (const std::size_t prefix : prefixes) {
+            for (const Prefixes& others : {least, most}) {
+                tried.push_back(others);
+                tried.back()[device] = prefix;
+            }
+        }
+    }
+    for (std::size_t i = 0; i < options_.randomStatesPerCut; ++i) {
+        tried.emplace_back();
+        for (const auto& [device, prefixes] : possible)
+            tried.back()[device] = prefixes[random() % prefixes.size()];
+    }
+    std::sort(tried.begin(), tried.end());
+    tried.erase(std::unique(tried.begin(), tried.end()), tried.end());
+    return tried;
+}
+
 bool PowerCut::dataIsSynced(std::size_t write, std::size_t done) const {
     for (std::size_t s = write + 1; s < done; ++s) {
         const LoggedOperation& operation = log_.operations[s];
-        if (operation.call == DiskCall::syncFileSystem ||
-            (operation.call == DiskCall::sync && operation.inode == log_.operations[write].inode))
+        const LoggedOperation& written = log_.operations[write];
+        if ((operation.call == DiskCall::syncFileSystem && operation.device == written.device) ||
+            (operation.call == DiskCall::sync && operation.inode == written.inode))
             return true;
     }
     return false;
@@ -79,7 +121,7 @@ bool PowerCut::isCertain(std::size_t index, std::size_t done) const {
         return dataIsSynced(index, done);
     for (std::size_t s = index + 1; s < done; ++s) {
         const LoggedOperation& sync = log_.operations[s];
-        if (sync.call == DiskCall::syncFileSystem ||
+        if ((sync.call == DiskCall::syncFileSystem && sync.device == operation.device) ||
             (sync.call == DiskCall::sync && (sync.inode == operation.directory || sync.inode == operation.toDirectory)))
             return true;
     }
@@ -97,18 +139,12 @@ void PowerCut::completeBackwards(std::vector<bool>& persisted) const {
 
 std::vector<PowerCut::Choice> PowerCut::orderedChoices(std::size_t done) const {
     std::mt19937_64 random(options_.seed * 1'000'003 + done);
-    const std::size_t committed = committedPrefix(done);
-    std::vector<std::size_t> prefixes = {committed};
-    for (std::size_t i = committed; i < done; ++i) {
-        const LoggedOperation& operation = log_.operations[i];
-        if (operation.changesNames() || operation.changesInode() || operation.call == DiskCall::orderData)
-            prefixes.push_back(i + 1);
-    }
     std::vector<Choice> choices;
-    const auto choose = [&](std::size_t prefix, const std::function<DataFate()>& fate) {
+    const auto choose = [&](const Prefixes& prefixes, const std::function<DataFate()>& fate) {
         Choice choice{std::vector<bool>(done), std::vector<DataFate>(done, DataFate::kept),
                       std::vector<std::size_t>(done)};
         for (std::size_t i = 0; i < done; ++i) {
+            const std::size_t prefix = prefixes.at(log_.operations[i].device);
             choice.persisted[i] = i < prefix;
             if (!log_.operations[i].writes() || dataIsSynced(i, done) || dataIsOrdered(i, prefix))
                 continue;
@@ -117,18 +153,11 @@ std::vector<PowerCut::Choice> PowerCut::orderedChoices(std::size_t done) const {
         }
         choices.push_back(std::move(choice));
     };
-    std::vector<std::size_t> tried = prefixes;
-    if (tried.size() > singleChangesMax) {
-        std::shuffle(tried.begin() + 1, tried.end() - 1, random);
-        std::swap(tried[1], tried.back());
-        tried.resize(singleChangesMax);
-    }
-    for (const std::size_t prefix : tried) {
+    for (const Prefixes& prefixes : prefixesToTry(done, random)) {
         for (const DataFate fate : {DataFate::lost, DataFate::kept, DataFate::zeros, DataFate::cut})
-            choose(prefix, [&] { return fate; });
+            choose(prefixes, [&] { return fate; });
+        choose(prefixes, [&] { return static_cast<DataFate>(random() % 4); });
     }
-    for (std::size_t i = 0; i < options_.randomStatesPerCut; ++i)
-        choose(prefixes[random() % prefixes.size()], [&] { return static_cast<DataFate>(random() % 4); });
     return choices;
 }
 
@@ -172,9 +201,11 @@ std::vector<PowerCut::Choice> PowerCut::unorderedChoices(std::size_t done) const
     choose(notData, lost);
     choose(notData, [] { return DataFate::zeros; });
     choose(notData, [] { return DataFate::cut; });
-    std::vector<std::size_t> single = uncertain;
-    std::shuffle(single.begin(), single.end(), random);
-    single.resize(std::min(single.size(), singleChangesMax));
+    // The latest ones are what the operation at hand did; of the earlier ones some have to do.
+    std::vector<std::size_t> single(uncertain.rbegin(), uncertain.rend());
+    if (single.size() > options_.singleChangesMax / 2)
+        std::shuffle(single.begin() + options_.singleChangesMax / 2, single.end(), random);
+    single.resize(std::min(single.size(), options_.singleChangesMax));
     for (const std::size_t one : single) {
         choose([&](std::size_t i) { return i != one; }, lost);
         choose([&](std::size_t i) { return i == one; }, lost);
@@ -236,7 +267,7 @@ LoopReport forEachPowerCut(const DiskLog& log, const PowerCutOptions& options,
     const PowerCut cut(log, options);
     LoopReport report;
     std::set<std::pair<std::string, std::size_t>> judged;
-    for (std::size_t done = 0; done <= log.operations.size(); ++done) {
+    for (std::size_t done = options.firstCut; done <= log.operations.size(); ++done) {
         for (const PowerCutState& state : cut.statesAfter(done)) {
             if (!judged.emplace(state.tree.describe(), state.marksPassed).second)
                 continue;

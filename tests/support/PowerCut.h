@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// What a disk may hold after a power cut, built from a log of disk operations.
+// What a disk may hold after a power cut, built from a log of disk operations. Each file system of the tree keeps its
+// own order and knows nothing of the others'.
 //
 // orderedJournal (ext4 with data=ordered, XFS): changes of names, modes, owners and attributes become durable in their
 // order, so a cut leaves the first so many of them: at least up to the last change of an inode that was synced since,
@@ -20,6 +21,7 @@
 #include "support/RecordingDisk.h"
 
 #include <functional>
+#include <random>
 
 namespace zor::support {
 
@@ -29,6 +31,10 @@ struct PowerCutOptions {
     DiskModel model = DiskModel::orderedJournal;
     std::uint64_t seed = 1;
     std::size_t randomStatesPerCut = 8;
+    /// More uncertain changes than this are not lost or kept one by one at a cut; the seeded choice has to do.
+    std::size_t singleChangesMax = 24;
+    /// No cut before so many operations: what a test has only to prepare.
+    std::size_t firstCut = 0;
     /// Where states are built.
     std::string scratch = "/dev/shm";
 };
@@ -58,10 +64,15 @@ private:
         std::vector<std::size_t> cutTo;
     };
 
+    /// For each file system, before which operation of the log its changes are there.
+    using Prefixes = std::map<dev_t, std::size_t>;
+
     [[nodiscard]] std::vector<Choice> orderedChoices(std::size_t done) const;
     [[nodiscard]] std::vector<Choice> unorderedChoices(std::size_t done) const;
-    /// How many operations are there at least.
-    [[nodiscard]] std::size_t committedPrefix(std::size_t done) const;
+    [[nodiscard]] std::size_t committedPrefix(std::size_t done, dev_t device) const;
+    /// Every prefix that a cut may leave of a file system, ascending.
+    [[nodiscard]] std::vector<std::size_t> possiblePrefixes(std::size_t done, dev_t device) const;
+    [[nodiscard]] std::vector<Prefixes> prefixesToTry(std::size_t done, std::mt19937_64& random) const;
     [[nodiscard]] bool dataIsSynced(std::size_t write, std::size_t done) const;
     [[nodiscard]] bool dataIsOrdered(std::size_t write, std::size_t prefix) const;
     [[nodiscard]] bool isCertain(std::size_t operation, std::size_t done) const;
@@ -73,6 +84,7 @@ private:
     const PowerCutOptions options_;
     /// For each operation on names the earlier ones that last changed the same names.
     std::vector<std::vector<std::size_t>> startedFrom_;
+    std::set<dev_t> devices_;
 };
 
 /// Judges every state after every operation of the log, each in a new directory (given to `judge`, which may change it)

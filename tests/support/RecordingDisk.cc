@@ -178,14 +178,27 @@ InodeId RecordingDisk::findEntry(InodeId directory, const std::string& name) con
     return entry == entries.end() ? 0 : entry->second;
 }
 
+RecordingDisk::Place RecordingDisk::place(int directory, std::string_view path) {
+    Place place{.directory = find(directory), .name = ""};
+    for (std::size_t slash = path.find('/'); slash != std::string_view::npos; slash = path.find('/')) {
+        if (place.directory != 0)
+            place.directory = findEntry(place.directory, std::string(path.substr(0, slash)));
+        path.remove_prefix(slash + 1);
+    }
+    place.name = path;
+    return place;
+}
+
 void RecordingDisk::add(LoggedOperation operation) {
+    if (operation.inode != 0)
+        operation.device = current_.inodes.at(operation.inode).device;
     apply(operation, current_);
     log_.operations.push_back(std::move(operation));
 }
 
 void RecordingDisk::addNew(DiskCall call, int directory, const char* name) {
-    const InodeId parent = find(directory);
-    if (parent == 0)
+    const Place at = place(directory, name);
+    if (at.directory == 0)
         return;
     struct stat status = {};
     if (::fstatat(directory, name, &status, AT_SYMLINK_NOFOLLOW) != 0) {
@@ -195,21 +208,21 @@ void RecordingDisk::addNew(DiskCall call, int directory, const char* name) {
     const InodeId id = nextId_++;
     // The file system may use the number of an inode that is gone again: the newest one is meant.
     known_[{status.st_dev, status.st_ino}] = id;
-    LoggedOperation operation{.call = call, .inode = id, .directory = parent, .name = name};
+    LoggedOperation operation{.call = call, .inode = id, .directory = at.directory, .name = at.name};
     operation.value = readInode(directory, name);
     current_.inodes[id] = operation.value;
     add(std::move(operation));
 }
 
 void RecordingDisk::addRemoval(DiskCall call, int directory, const char* name) {
-    const InodeId parent = find(directory);
-    if (parent == 0)
+    const Place at = place(directory, name);
+    if (at.directory == 0)
         return;
-    const InodeId id = findEntry(parent, name);
+    const InodeId id = findEntry(at.directory, at.name);
     if (id == 0)
         complaint_ += std::string("\"") + name + "\" was removed, which nothing recorded made; ";
     else
-        add({.call = call, .inode = id, .directory = parent, .name = name});
+        add({.call = call, .inode = id, .directory = at.directory, .name = at.name});
 }
 
 void RecordingDisk::addChange(DiskCall call, int fd) {
@@ -262,12 +275,12 @@ int RecordingDisk::makeHardLink(int fromDirectory, const char* from, int toDirec
     const int result = inner_.makeHardLink(fromDirectory, from, toDirectory, to);
     if (result != 0)
         return result;
-    const InodeId source = find(fromDirectory);
-    const InodeId parent = find(toDirectory);
-    const InodeId id = source == 0 ? 0 : findEntry(source, from);
-    if (parent != 0 && id != 0)
-        add({.call = DiskCall::makeHardLink, .inode = id, .directory = parent, .name = to});
-    else if (parent != 0 || source != 0)
+    const Place source = place(fromDirectory, from);
+    const Place link = place(toDirectory, to);
+    const InodeId id = source.directory == 0 ? 0 : findEntry(source.directory, source.name);
+    if (link.directory != 0 && id != 0)
+        add({.call = DiskCall::makeHardLink, .inode = id, .directory = link.directory, .name = link.name});
+    else if (link.directory != 0 || source.directory != 0)
         complaint_ += std::string("a link \"") + to + "\" to what is not recorded; ";
     return result;
 }
@@ -285,24 +298,24 @@ int RecordingDisk::rename(int fromDirectory, const char* from, int toDirectory, 
     const int result = inner_.rename(fromDirectory, from, toDirectory, to, flags);
     if (result != 0)
         return result;
-    const InodeId source = find(fromDirectory);
-    const InodeId destination = find(toDirectory);
-    if (source == 0 && destination == 0)
+    const Place source = place(fromDirectory, from);
+    const Place destination = place(toDirectory, to);
+    if (source.directory == 0 && destination.directory == 0)
         return result;
-    const InodeId moved = source == 0 ? 0 : findEntry(source, from);
-    if (moved == 0 || destination == 0) {
+    const InodeId moved = source.directory == 0 ? 0 : findEntry(source.directory, source.name);
+    if (moved == 0 || destination.directory == 0) {
         complaint_ += std::string("a move of \"") + from + "\" from or to where nothing is recorded; ";
         return result;
     }
-    const InodeId replaced = findEntry(destination, to);
+    const InodeId replaced = findEntry(destination.directory, destination.name);
     if (replaced == moved)
         return result; // Two names of one inode: the system call does nothing.
     add({.call = DiskCall::rename,
          .inode = moved,
-         .directory = source,
-         .name = from,
-         .toDirectory = destination,
-         .toName = to,
+         .directory = source.directory,
+         .name = source.name,
+         .toDirectory = destination.directory,
+         .toName = destination.name,
          .replaced = replaced,
          .exchange = (flags & RENAME_EXCHANGE) != 0});
     return result;
@@ -403,10 +416,8 @@ int RecordingDisk::syncFileSystem(int fd) {
     const MutexLock lock(mutex_);
     const int result = inner_.syncFileSystem(fd);
     struct stat synced = {};
-    struct stat ours = {};
-    const bool same = ::fstat(fd, &synced) == 0 && ::stat(root_.c_str(), &ours) == 0 && synced.st_dev == ours.st_dev;
-    if (result == 0 && recording_ && same)
-        add({.call = DiskCall::syncFileSystem});
+    if (result == 0 && recording_ && ::fstat(fd, &synced) == 0)
+        add({.call = DiskCall::syncFileSystem, .device = synced.st_dev});
     return result;
 }
 

@@ -22,6 +22,8 @@ struct LoggedOperation {
     DiskCall call = DiskCall::sync;
     /// Made, linked, moved, removed, changed, written or synced; 0 for syncFileSystem.
     InodeId inode = 0;
+    /// The file system that it happens on.
+    dev_t device = 0;
     /// Where its name is, or was before a rename.
     InodeId directory = 0;
     std::string name;
@@ -94,6 +96,12 @@ private:
     /// 0 when the inode is not recorded.
     InodeId find(int fd) ZOR_REQUIRES(mutex_);
     [[nodiscard]] InodeId findEntry(InodeId directory, const std::string& name) const ZOR_REQUIRES(mutex_);
+    /// Where a name is that was given as a path below an open directory.
+    struct Place {
+        InodeId directory = 0;
+        std::string name;
+    };
+    [[nodiscard]] Place place(int directory, std::string_view path) ZOR_REQUIRES(mutex_);
     void add(LoggedOperation operation) ZOR_REQUIRES(mutex_);
     void addNew(DiskCall call, int directory, const char* name) ZOR_REQUIRES(mutex_);
     void addRemoval(DiskCall call, int directory, const char* name) ZOR_REQUIRES(mutex_);

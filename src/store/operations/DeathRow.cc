@@ -4,7 +4,7 @@
 // A move here is one rename on the caller's thread, usually under the locks of its operation; the item gets a unique
 // directory of its own, so names never collide. Passes run one after another on the death-row queue and take no lock: what is on
 // death row belongs to no container. A stop at any point leaves items, or empty unique directories, for the next pass; the
-// launch queues one.
+// launch queues one. What a power cut leaves is the same: nothing is removed whose move here could still be undone.
 #include "daemon/ZORClientConnection.h"
 #include "store/StoreServices.h"
 
@@ -73,6 +73,19 @@ std::optional<ZORError> ZORClientConnection::deleteEverythingOnDeathRow() {
     if (!items)
         return makeError(services_.log, here, ErrorCode::listForDeletionFailed, &items.error(), LogFlag::yes,
                          "Failed to get items for deletion: %s : %s", deathRow.c_str(), items.error().text().c_str());
+    for (FileURL& leftover : services_.fileManager.copyLeftoversInDirectoryAtURL(deathRow))
+        items->push_back(std::move(leftover));
+    if (items->empty())
+        return std::nullopt;
+    // Where nothing keeps the order of changes, a power cut could else bring back a container that is half removed.
+    const auto opened = services_.fileManager.resolver().openDirectory(deathRow);
+    const int status = opened ? services_.durability.beforeRemoval(opened->get()) : -opened.error();
+    if (status < 0) {
+        const ZORError cause =
+            posixError(here, -status, "sync of %s failed: %s", deathRow.c_str(), errorText(-status));
+        return makeError(services_.log, here, ErrorCode::listForDeletionFailed, &cause, LogFlag::yes,
+                         "Failed to get items for deletion: %s : %s", deathRow.c_str(), cause.text().c_str());
+    }
     std::optional<ZORError> last;
     for (const FileURL& item : *items) {
         const auto removed = _removeItemOrMoveToTempAtURL(item);

@@ -120,6 +120,17 @@ void ZORClientConnection::sweepStaging() {
     }
     for (const FileURL& entry : *entries)
         (void)_moveItemAtURLToDeathRow(entry, StartDeletionThread::no);
+    for (const FileURL& leftover : services_.fileManager.copyLeftoversInDirectoryAtURL(staging))
+        (void)_moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
+}
+
+void ZORClientConnection::makeDirectoriesDurable() {
+    const FileURL library = services_.configuration.libraryDirectory();
+    const auto directory = services_.fileManager.resolver().openDirectory(library);
+    const int status = directory ? services_.durability.afterMove(directory->get()) : -directory.error();
+    if (status < 0)
+        services_.log.write(logLevelError, "containerManagerSetup", "sync of %s failed: %s", library.c_str(),
+                            errorText(-status));
 }
 
 void ZORClientConnection::containerManagerSetup() {
@@ -128,6 +139,8 @@ void ZORClientConnection::containerManagerSetup() {
     // A stop between the move of a container and its mapping leaves a mapping that points to nothing.
     if (const unsigned removed = services_.sandbox.removeDanglingMappings())
         services_.log.write(logLevelNotice, __func__, "Removed %u sandbox mappings whose container is gone", removed);
+    // Files that are acknowledged one by one later lie in directories that must not go with the power.
+    makeDirectoriesDurable();
     // What the boot's passes read is older than what they cleaned up afterwards.
     services_.cache.dropAll();
 }

@@ -1,0 +1,33 @@
+// SPDX-License-Identifier: Apache-2.0
+// What the daemon does to the disk, one scenario each, for the loops over faults and power cuts.
+#pragma once
+
+#include "crash/StoreWorld.h"
+
+#include <gtest/gtest.h>
+
+namespace zor::support {
+
+struct Scenario {
+    std::string name;
+    /// Runs before the first fault or cut, on a launched daemon. What it puts into `promised` stays promised.
+    std::function<void(Device&)> prepare;
+    /// Puts what was acknowledged into `promised`.
+    std::function<void(Device&)> act;
+    /// What a client may ask for afterwards.
+    std::vector<Request> requests;
+    /// Whether the daemon that met an error must serve the requests at once. A daemon cannot be asked for what a test
+    /// took from under it.
+    bool goesOnAfterErrors = true;
+    /// Judges what only this scenario knows of; after a restart. `acted` when act came to its end without an error.
+    std::function<std::string(const std::string& root, bool acted)> also;
+};
+
+/// Creation in each group of classes, transient creation again, death row, the entitlement file and the launch.
+std::vector<Scenario> storeScenarios();
+/// Those that work in the user's home.
+std::vector<Scenario> homeScenarios();
+/// As test names are spelled.
+std::string scenarioName(const ::testing::TestParamInfo<Scenario>& parameter);
+
+} // namespace zor::support

@@ -1,0 +1,221 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "crash/StoreWorld.h"
+
+#include "daemon/Daemon.h"
+#include "support/ProcessResources.h"
+
+#include <algorithm>
+#include <fstream>
+#include <sched.h>
+#include <stdexcept>
+#include <sys/mount.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+namespace zor::support {
+
+namespace {
+
+platform::Platform withRoles(platform::LinuxPlatform& linuxPlatform, platform::Disk& disk, platform::PlatformLog& log,
+                             platform::FileProtectionClass& protection, platform::SandboxUserState& sandbox,
+                             platform::BootMarker& marker, platform::WorkQueue& queue) {
+    const platform::Platform real = linuxPlatform.roles();
+    return {.root = real.root,
+            .disk = disk,
+            .log = log,
+            .internalBuild = real.internalBuild,
+            .systemVersion = real.systemVersion,
+            .passwords = real.passwords,
+            .lockState = real.lockState,
+            .protection = protection,
+            .sandbox = sandbox,
+            .crash = real.crash,
+            .bootMarker = marker,
+            .transactions = real.transactions,
+            .deathRowQueue = queue,
+            .lockStateQueue = queue,
+            .runLoop = real.runLoop,
+            .peers = real.peers,
+            .listener = real.listener,
+            .upcallPort = real.upcallPort};
+}
+
+std::unique_ptr<platform::LinuxPlatform> openPlatform(const std::string& root) {
+    auto opened = platform::LinuxPlatform::open({.rootDirectory = root});
+    if (!opened)
+        throw std::runtime_error(opened.error());
+    return std::move(*opened);
+}
+
+/// What must hold of a store at rest.
+std::string judgeAtRest(const std::string& root, const std::vector<Acknowledged>& promised, Leftovers leftovers) {
+    const FileTree tree = readTree(root, {"run"});
+    const StoreFindings findings = judgeStore(tree, Transients::judged);
+    if (!findings.complaint.empty())
+        return findings.complaint;
+    if (!findings.staging.empty())
+        return "staging still holds " + findings.staging.front();
+    if (!findings.deathRow.empty())
+        return "death row still holds " + findings.deathRow.front();
+    if (leftovers == Leftovers::none && !tree.inodes.at(tree.resolve("tmp")).entries.empty())
+        return "something was put into tmp";
+    if (leftovers == Leftovers::none && !findings.doubled.empty())
+        return findings.doubled;
+    for (const Acknowledged& promise : promised) {
+        const auto isIt = [&](const StoredContainer& container) {
+            return std::string(root).append("/").append(container.path) == promise.path &&
+                   container.uuid == promise.uuid && container.identifier == promise.request.identifier;
+        };
+        if (std::ranges::none_of(findings.containers, isIt))
+            return promise.request.identifier + " was acknowledged and is not there";
+    }
+    return "";
+}
+
+std::string judgeRequests(StoreDaemon& daemon, const std::string& root, std::vector<Acknowledged>& promised,
+                          const std::vector<Request>& requests, Leftovers leftovers) {
+    // Asking for a transient container throws away the one there is.
+    for (const auto& [request, path, uuid] : promised) {
+        if (request.transient)
+            continue;
+        const auto answer = daemon.lookUp(request);
+        if (!answer.acknowledged || answer.acknowledged->uuid != uuid || answer.acknowledged->path != path)
+            return request.identifier + " was acknowledged and is not found: " + daemon.log();
+    }
+    for (const Request& request : requests) {
+        const auto found = daemon.lookUp(request);
+        if (!found.acknowledged && found.code != ErrorCode::notFound)
+            return request.identifier + " is answered with " + std::to_string(static_cast<int>(found.code)) + ": " +
+                   daemon.log();
+        const auto created = daemon.create(request);
+        if (!created.acknowledged)
+            return request.identifier + " cannot be created: " + daemon.log();
+        if (found.acknowledged && !request.transient && created.acknowledged->uuid != found.acknowledged->uuid)
+            return request.identifier + " was found and then made again";
+        add(promised, *created.acknowledged);
+    }
+    if (daemon.composition().locks().identifiersInUse() != 0)
+        return "an identifier is still locked";
+    return judgeAtRest(root, promised, leftovers);
+}
+
+} // namespace
+
+void MemoryLog::write(int level, std::string_view function, std::string_view message) {
+    constexpr std::size_t textBytesMax = 20'000;
+    text += "\n    <" + std::to_string(level) + "> " + std::string(function) + ": " + std::string(message);
+    if (text.size() > textBytesMax)
+        text.erase(0, text.size() - textBytesMax);
+}
+
+void furnishRoot(const std::string& root) {
+    for (const char* directory : {"etc", "tmp", "private", "private/var", "private/var/mobile", "private/var/brevad"}) {
+        if (::mkdir((root + "/" + directory).c_str(), 0755) != 0)
+            throw std::runtime_error(std::string("cannot make ") + directory);
+    }
+    ::chmod(root.c_str(), 0755);
+    if (::geteuid() == 0 && (::chown((root + "/private/var/mobile").c_str(), 501, 501) != 0 ||
+                             ::chown((root + "/private/var/brevad").c_str(), 33, 33) != 0))
+        throw std::runtime_error("cannot give homes to their users");
+    std::ofstream(root + "/etc/passwd") << "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
+}
+
+void add(std::vector<Acknowledged>& promised, const Acknowledged& promise) {
+    std::erase_if(promised, [&](const Acknowledged& earlier) {
+        return promise.request.transient && earlier.request.transient &&
+               earlier.request.identifier == promise.request.identifier;
+    });
+    promised.push_back(promise);
+}
+
+fs::Ordering journalEverywhere(int) {
+    return fs::Ordering::journal;
+}
+fs::Ordering noOrderAnywhere(int) {
+    return fs::Ordering::none;
+}
+
+StoreDaemon::StoreDaemon(const std::string& root, platform::BootMarker& marker, platform::Disk& disk,
+                         fs::Durability::Probe probe)
+    : root_(root), platform_(openPlatform(root)), protection_(platform_->root(), disk, platform_->roles().lockState),
+      sandbox_(platform_->root(), disk),
+      composition_(std::make_unique<Composition>(
+          withRoles(*platform_, disk, log_, protection_, sandbox_, marker, queue_), probe)) {
+    (void)composition_->store(); // reads the entitlement file, as a start does
+}
+
+StoreDaemon::~StoreDaemon() {
+    platform_->finish();
+}
+
+void StoreDaemon::launch() {
+    Daemon(*composition_, {}).setUp();
+}
+
+StoreDaemon::Answer StoreDaemon::ask(const Request& request, bool createIfNecessary) {
+    const auto found = composition_->sharedClientConnection()->createOrLookupContainerForUser(
+        request.userId, &request.identifier, request.containerClass,
+        {.createIfNecessary = createIfNecessary, .transient = request.transient});
+    if (!found)
+        return {.acknowledged = std::nullopt, .code = found.error().replyCode()};
+    return {.acknowledged = Acknowledged{request, found->path, found->uuid.string()}};
+}
+
+bool homesCanBeMounted() {
+    static const bool can =
+        ::unshare(CLONE_NEWNS) == 0 && ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0;
+    return can;
+}
+
+Device::Device(const std::string& parent, Home whereHome) : root(parent), home(whereHome) {
+    furnishRoot(root.path());
+    const std::string path = root.path() + "/private/var/mobile";
+    if (home == Home::mounted &&
+        (!homesCanBeMounted() || ::mount("home", path.c_str(), "tmpfs", 0, "mode=0755,uid=501,gid=501") != 0))
+        throw std::runtime_error("cannot mount a home");
+}
+
+Device::~Device() {
+    daemon.reset();
+    if (home == Home::mounted)
+        ::umount2((root.path() + "/private/var/mobile").c_str(), MNT_DETACH);
+}
+
+void Device::start(platform::Disk& onDisk, fs::Durability::Probe probe) {
+    disk = &onDisk;
+    daemon = std::make_unique<StoreDaemon>(root.path(), marker, onDisk, probe);
+    daemon->launch();
+}
+
+bool Device::create(const Request& request) {
+    const auto answer = daemon->create(request);
+    if (answer.acknowledged)
+        add(promised, *answer.acknowledged);
+    return answer.acknowledged.has_value();
+}
+
+std::string judgeAfterRestart(const std::string& root, platform::BootMarker& marker, fs::Durability::Probe probe,
+                              const std::vector<Acknowledged>& promised, const std::vector<Request>& requests,
+                              Leftovers leftovers) {
+    const bool boots = !marker.look().present;
+    const StoreFindings asItLies =
+        judgeStore(readTree(root, {"run"}), boots ? Transients::ignored : Transients::judged);
+    if (!asItLies.complaint.empty())
+        return "before the launch: " + asItLies.complaint;
+    std::vector<Acknowledged> kept = promised;
+    if (boots)
+        std::erase_if(kept, [](const Acknowledged& one) { return one.request.transient; });
+    const ProcessResources before;
+    {
+        platform::LinuxDisk disk;
+        StoreDaemon daemon(root, marker, disk, probe);
+        daemon.launch();
+        if (std::string complaint = judgeAtRest(root, kept, leftovers); !complaint.empty())
+            return "after the launch: " + complaint + daemon.log();
+        if (std::string complaint = judgeRequests(daemon, root, kept, requests, leftovers); !complaint.empty())
+            return complaint;
+    }
+    return before.leakedSince();
+}
+
+} // namespace zor::support

@@ -1,0 +1,165 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "support/StoreJudge.h"
+
+#include "plist/Read.h"
+
+#include <algorithm>
+#include <array>
+#include <unistd.h>
+
+namespace zor::support {
+
+namespace {
+
+constexpr const char* stagingPath = "private/var/root/Library/Caches/com.veltra.zorvaned/Staging";
+constexpr const char* deathRowPath = "private/var/root/Library/Caches/com.veltra.zorvaned/Dead";
+
+struct Place {
+    const char* live;
+    const char* transient;
+};
+constexpr Place bundles = {"private/var/containers", "private/var/brevad/Library/Caches/com.veltra.zorvaned"};
+constexpr Place system = {"private/var/containers", "private/var/root/Library/Caches/com.veltra.zorvaned/Temp"};
+constexpr Place mobile = {"private/var/mobile/Containers",
+                          "private/var/mobile/Containers/Library/Caches/com.veltra.zorvaned/Temp"};
+
+enum class Inside { nothing, data, group };
+
+struct ContainerKind {
+    std::uint64_t number;
+    const char* name;
+    Place place;
+    std::uint32_t user;
+    std::uint32_t owner;
+    Inside inside;
+    mode_t insideMode;
+};
+
+constexpr std::array<ContainerKind, 13> kinds = {{
+    {1, "Bundle/Application", bundles, 33, 33, Inside::nothing, 0},
+    {2, "Data/Application", mobile, 501, 501, Inside::data, 0755},
+    {3, "Bundle/KolvexPlugin", bundles, 33, 33, Inside::nothing, 0},
+    {4, "Data/KolvexPlugin", mobile, 501, 501, Inside::data, 0755},
+    {5, "Bundle/VPNPlugin", bundles, 33, 33, Inside::nothing, 0},
+    {6, "Data/VPNPlugin", mobile, 501, 501, Inside::data, 0755},
+    {7, "Shared/AppGroup", mobile, 501, 501, Inside::group, 0755},
+    {8, "Bundle/Framework", bundles, 33, 33, Inside::nothing, 0},
+    {9, "Data/IpsiService", mobile, 501, 501, Inside::data, 0755},
+    {10, "Data/InternalDaemon", mobile, 501, 501, Inside::data, 0755},
+    {11, "Data/TempDir", mobile, 501, 501, Inside::data, 0755},
+    {12, "Data/System", system, 499, 0, Inside::data, 0777},
+    {13, "Shared/SystemGroup", system, 499, 0, Inside::group, 0777},
+}};
+
+std::vector<const char*> subdirectoriesOf(Inside inside) {
+    switch (inside) {
+    case Inside::nothing:
+        return {};
+    case Inside::group:
+        return {"Library", "Library/Caches"};
+    case Inside::data:
+        return {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp"};
+    }
+    return {};
+}
+
+/// What is wrong with the kind, mode or owner; empty when nothing is. Only root can give things to others.
+std::string attributesComplaint(const Inode& inode, mode_t kindAndMode, std::uint32_t owner) {
+    if (inode.mode != kindAndMode)
+        return "has mode " + std::to_string(inode.mode);
+    const bool ownersCount = ::geteuid() == 0;
+    if (ownersCount && (inode.uid != owner || inode.gid != owner))
+        return "belongs to " + std::to_string(inode.uid) + ":" + std::to_string(inode.gid);
+    return "";
+}
+
+std::string readMetadata(const Inode& file, const ContainerKind& kind, StoredContainer& container) {
+    if (const std::string wrong = attributesComplaint(file, S_IFREG | 0644, 0); !wrong.empty())
+        return "its metadata file " + wrong;
+    const auto value = plist::readPropertyList(file.content);
+    const plist::Dictionary* content = value ? value->asDictionary() : nullptr;
+    if (!content)
+        return "its metadata file holds no dictionary";
+    const std::string* identifier = content->string("ZORMetadataIdentifier");
+    const std::string* uuid = content->string("ZORMetadataUUID");
+    if (!identifier || !uuid || uuid->size() != 36)
+        return "its metadata file lacks the identifier or the UUID";
+    if (content->unsignedInteger("ZORMetadataContentClass") != kind.number ||
+        content->unsignedInteger("ZORMetadataPersona") != kind.user)
+        return "its metadata file is another class's or user's";
+    container.identifier = *identifier;
+    container.uuid = *uuid;
+    return "";
+}
+
+std::string judgeContainer(const FileTree& tree, InodeId id, const ContainerKind& kind, StoredContainer& container) {
+    const Inode& top = tree.inodes.at(id);
+    if (const std::string wrong = attributesComplaint(top, S_IFDIR | 0755, kind.owner); !wrong.empty())
+        return wrong;
+    for (const char* subdirectory : subdirectoriesOf(kind.inside)) {
+        const InodeId inside = tree.resolve(container.path + "/" + subdirectory);
+        if (inside == 0)
+            return std::string("lacks ") + subdirectory;
+        const std::string wrong = attributesComplaint(tree.inodes.at(inside), S_IFDIR | kind.insideMode, kind.owner);
+        if (!wrong.empty())
+            return std::string("its ") + subdirectory + " " + wrong;
+    }
+    const auto metadata = top.entries.find(".com.veltra.zorvane.metadata.plist");
+    if (metadata == top.entries.end())
+        return "lacks its metadata file";
+    return readMetadata(tree.inodes.at(metadata->second), kind, container);
+}
+
+void judgeClassDirectory(const FileTree& tree, const ContainerKind& kind, bool transient, StoreFindings& findings) {
+    const std::string path = std::string(transient ? kind.place.transient : kind.place.live) + "/" + kind.name;
+    const InodeId directory = tree.resolve(path);
+    if (directory == 0)
+        return;
+    for (const auto& [name, id] : tree.inodes.at(directory).entries) {
+        // Copies on their way from another file system are hidden: they have no final name yet.
+        if (name.starts_with("."))
+            continue;
+        StoredContainer container{.classNumber = kind.number, .transient = transient, .path = path + "/" + name};
+        const std::string wrong = judgeContainer(tree, id, kind, container);
+        if (!wrong.empty())
+            findings.complaint += container.path + " " + wrong + "; ";
+        else if (findings.find(kind.number, transient, container.identifier) != nullptr)
+            findings.doubled += container.path + " is a second container of " + container.identifier + "; ";
+        if (wrong.empty())
+            findings.containers.push_back(std::move(container));
+    }
+}
+
+std::vector<std::string> namesIn(const FileTree& tree, const char* path) {
+    std::vector<std::string> names;
+    if (const InodeId directory = tree.resolve(path)) {
+        for (const auto& [name, id] : tree.inodes.at(directory).entries)
+            names.push_back(name);
+    }
+    return names;
+}
+
+} // namespace
+
+const StoredContainer* StoreFindings::find(std::uint64_t classNumber, bool transient,
+                                           const std::string& identifier) const {
+    const auto found = std::find_if(containers.begin(), containers.end(), [&](const StoredContainer& container) {
+        return container.classNumber == classNumber && container.transient == transient &&
+               container.identifier == identifier;
+    });
+    return found == containers.end() ? nullptr : &*found;
+}
+
+StoreFindings judgeStore(const FileTree& tree, Transients transients) {
+    StoreFindings findings;
+    for (const ContainerKind& kind : kinds) {
+        judgeClassDirectory(tree, kind, false, findings);
+        if (transients == Transients::judged)
+            judgeClassDirectory(tree, kind, true, findings);
+    }
+    findings.staging = namesIn(tree, stagingPath);
+    findings.deathRow = namesIn(tree, deathRowPath);
+    return findings;
+}
+
+} // namespace zor::support
