@@ -162,40 +162,51 @@ TEST(ListenerFrame, PipelinedRequestsAreServedInOrder) {
     EXPECT_TRUE(world.isAtRest());
 }
 
-// Goal: one client with endless requests does not hold up another. Method: one thread serves; a peer with thousands of
-// queued requests and one with a single request: the single one comes after at most a few turns.
+// Goal: neither does a client with endless requests hold up others, nor do many others hold it up. Method: one thread
+// serves a peer with hundreds of queued requests and a hundred peers with one: who comes when is counted.
 TEST(ListenerFrame, AFloodTakesTurnsWithOthers) {
     ListenerWorld world;
     world.limits.threadsRunning = 1;
     world.limits.threadsMax = 1;
+    constexpr int floodCount = 400;
+    constexpr int singleCount = 100;
     std::mutex gate;
     std::atomic<int> floodServed{0};
-    std::atomic<int> floodServedBefore{-1};
+    std::atomic<int> singlesServed{0};
+    std::atomic<int> floodBeforeFirstSingle{-1};
+    std::atomic<int> floodBeforeLastSingle{-1};
     world.start([&](PeerConnection&, ServiceEvent& event) {
-        if (event.request.isTrue("Single")) {
-            floodServedBefore = floodServed.load();
-            event.reply->send(event.request);
+        const std::lock_guard lock(gate);
+        if (!event.request.isTrue("Single")) {
+            ++floodServed;
             return;
         }
-        const std::lock_guard lock(gate);
-        ++floodServed;
+        const int served = ++singlesServed;
+        if (served == 1)
+            floodBeforeFirstSingle = floodServed.load();
+        if (served == singleCount)
+            floodBeforeLastSingle = floodServed.load();
     });
     RawClient flood(world.socketPath());
-    RawClient single(world.socketPath());
+    std::vector<std::unique_ptr<RawClient>> singles;
+    for (int i = 0; i < singleCount; ++i)
+        singles.push_back(std::make_unique<RawClient>(world.socketPath()));
+    ASSERT_TRUE(eventually([&] { return world.listener().counters().connections == singleCount + 1; }));
     {
         const std::lock_guard closed(gate);
         plist::Data all;
-        for (int i = 0; i < 400; ++i) {
+        for (int i = 0; i < floodCount; ++i) {
             const plist::Data frame = frameOf(numbered(1), 0, 0);
             all.insert(all.end(), frame.begin(), frame.end());
         }
         ASSERT_TRUE(flood.send(all));
         ASSERT_TRUE(eventually([&] { return world.counts.messages == 1; }));
-        ASSERT_TRUE(single.send(plist::Dictionary{{"Single", true}}, 1));
+        for (const auto& single : singles)
+            ASSERT_TRUE(single->send(plist::Dictionary{{"Single", true}}, 1));
     }
-    ASSERT_TRUE(single.receive());
-    EXPECT_LE(floodServedBefore, 3 * static_cast<int>(world.limits.framesPerTurn));
-    EXPECT_TRUE(eventually([&] { return floodServed == 400; }));
+    ASSERT_TRUE(eventually([&] { return singlesServed == singleCount && floodServed == floodCount; }));
+    EXPECT_LE(floodBeforeFirstSingle, 3 * static_cast<int>(world.limits.framesPerTurn));
+    EXPECT_EQ(floodBeforeLastSingle, floodCount);
 }
 
 // Goal: replies that handlers keep go to the right request whenever they come, once, and nowhere after the end. Method:

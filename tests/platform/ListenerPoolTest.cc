@@ -110,6 +110,66 @@ TEST(ListenerPool, GrowsWhileHandlersWaitAndShrinksAfterwards) {
     }
 }
 
+// Goal: the pool reacts to what workers say at once, without the watcher. Method: a tick of an hour, and the three ways
+// in which work can be left without a worker.
+TEST(ListenerPool, GrowsAtOnceWhenWorkersSaySo) {
+    ListenerWorld world;
+    world.limits.threadsRunning = 2;
+    world.limits.tick = std::chrono::hours(1);
+    Gate working;
+    Gate blocked;
+    std::atomic<int> floodServed{0};
+    world.start([&](PeerConnection&, ServiceEvent& event) {
+        const std::uint64_t number = event.request.unsignedInteger("Number").value_or(0);
+        if (number == 1 || number == 3)
+            working.wait(Announced::no);
+        if (number == 1 || number == 2)
+            blocked.wait(Announced::yes);
+        if (number == 4)
+            ++floodServed;
+        if (event.reply)
+            event.reply->send(event.request);
+    });
+    std::vector<std::unique_ptr<RawClient>> clients;
+    const auto request = [&](std::uint64_t number) {
+        clients.push_back(std::make_unique<RawClient>(world.socketPath()));
+        ASSERT_TRUE(clients.back()->send(numbered(number), number));
+    };
+    RawClient other(world.socketPath());
+    // Nobody waits any more when these two say that they block.
+    request(1);
+    request(1);
+    ASSERT_TRUE(eventually([&] { return working.inside() == 2; }));
+    working.letOneThrough();
+    ASSERT_TRUE(eventually([&] { return blocked.inside() == 1; }));
+    EXPECT_TRUE(other.isServed());
+    working.letOneThrough();
+    ASSERT_TRUE(eventually([&] { return blocked.inside() == 2; }));
+    EXPECT_TRUE(other.isServed());
+    // One blocks while another waits; then that one works, and another may run beside it.
+    request(2);
+    ASSERT_TRUE(eventually([&] { return blocked.inside() == 3; }));
+    request(3);
+    ASSERT_TRUE(eventually([&] { return working.inside() == 1; }));
+    EXPECT_TRUE(other.isServed());
+    EXPECT_EQ(world.listener().counters().threads, 5U);
+    // Requests that wait for their turn are taken over when the worker that left them there gets busy.
+    plist::Data flood;
+    for (int i = 0; i < 2000; ++i) {
+        const plist::Data frame = frameOf(numbered(4), 0, 0);
+        flood.insert(flood.end(), frame.begin(), frame.end());
+    }
+    std::thread sender([&] { EXPECT_TRUE(other.send(flood)); });
+    working.letOneThrough();
+    request(3);
+    EXPECT_TRUE(eventually([&] { return floodServed == 2000 && working.inside() == 1; }));
+    sender.join();
+    working.open();
+    blocked.open();
+    for (const auto& client : clients)
+        EXPECT_TRUE(client->receive());
+}
+
 // Goal: at the limit requests wait, and none is lost. Method: one more request than there are threads, all blocked.
 TEST(ListenerPool, WorkWaitsWhenEveryThreadIsBlocked) {
     ListenerWorld world;
@@ -237,6 +297,11 @@ TEST(ListenerPool, ConnectionsEndWhileRepliesAreUnderWay) {
             for (int life = 0; life < 150; ++life) {
                 RawClient client(world.socketPath());
                 const std::uint64_t first = random() << 32U;
+                // Some wait for late replies, each of which finds the connection just let go, or just taken.
+                for (std::uint64_t i = 0; i < 5 && life % 3 == 0; ++i)
+                    ASSERT_TRUE(client.send(numbered(0), first + i));
+                for (std::uint64_t i = 0; i < 5 && life % 3 == 0; ++i)
+                    ASSERT_TRUE(client.receive());
                 const std::uint64_t requests = random() % 12;
                 for (std::uint64_t i = 0; i < requests; ++i)
                     if (!client.send(numbered((random() & 0xFF)), first + i))

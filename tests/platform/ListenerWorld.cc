@@ -147,25 +147,35 @@ void ListenerWorld::start(MessageHandler onMessage) {
     };
     listener_ = std::make_unique<LinuxServiceListener>(identity, std::move(options));
     const bool resumed = listener_->resume([this](PeerConnection& connection, ServiceEvent& event) {
-        switch (event.kind) {
-        case ServiceEvent::Kind::message:
-            ++counts.messages;
-            if (onMessage_)
-                onMessage_(connection, event);
-            else if (event.reply)
-                event.reply->send(event.request);
-            return;
-        case ServiceEvent::Kind::other:
-            ++counts.others;
-            EXPECT_EQ(event.reply, nullptr);
-            return;
-        case ServiceEvent::Kind::invalid:
-            ++counts.invalids;
-            return;
+        {
+            const std::lock_guard lock(mutex_);
+            EXPECT_TRUE(inHandler_.insert(&connection).second) << "two events of one connection at once";
         }
+        handle(connection, event);
+        const std::lock_guard lock(mutex_);
+        inHandler_.erase(&connection);
     });
     if (!resumed)
         throw std::system_error(errno, std::generic_category(), "resume");
+}
+
+void ListenerWorld::handle(PeerConnection& connection, ServiceEvent& event) {
+    switch (event.kind) {
+    case ServiceEvent::Kind::message:
+        ++counts.messages;
+        if (onMessage_)
+            onMessage_(connection, event);
+        else if (event.reply)
+            event.reply->send(event.request);
+        return;
+    case ServiceEvent::Kind::other:
+        ++counts.others;
+        EXPECT_EQ(event.reply, nullptr);
+        return;
+    case ServiceEvent::Kind::invalid:
+        ++counts.invalids;
+        return;
+    }
 }
 
 void ListenerWorld::stop() {

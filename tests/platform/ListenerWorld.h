@@ -15,6 +15,7 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -80,7 +81,8 @@ public:
     ListenerWorld();
     ~ListenerWorld();
 
-    /// Starts; `onMessage` gets the messages (the request comes back when it is empty), `counts` all events.
+    /// Starts; `onMessage` gets the messages (the request comes back when it is empty), `counts` all events. That a
+    /// connection has one event at a time is checked for every one.
     void start(MessageHandler onMessage = {});
     void stop();
     /// Where everything was given back: no connection, no byte, no peer. Waits up to ten seconds for it.
@@ -95,11 +97,14 @@ public:
     EventCounts counts;
 
 private:
+    void handle(PeerConnection& connection, ServiceEvent& event);
+
     std::string directory_;
     FileDescriptor directoryDescriptor_;
     std::string socketPath_;
     MessageHandler onMessage_;
     std::mutex mutex_;
+    std::set<const PeerConnection*> inHandler_;
     std::vector<std::string> reports_;
     std::unique_ptr<LinuxServiceListener> listener_;
 };
