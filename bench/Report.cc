@@ -70,15 +70,23 @@ Machine Machine::here() {
 void printTable(const Machine& machine, const std::vector<Figure>& figures) {
     std::printf("\n%s, %u processors, %s, load before the run %.2f\n\n", machine.processor.c_str(), machine.processors,
                 machine.kernel.c_str(), machine.loadBefore);
-    std::printf("%-46s %14s %14s %12s %14s  %s\n", "figure", "measured", "floor", "value", "goal", "verdict");
+    // As Markdown takes it: docs/performance.md holds the last such table.
+    const auto row = [](const char* what, const std::string& measured, const std::string& floor,
+                        const std::string& value, const std::string& goal, const char* verdict) {
+        std::printf("| %-48s | %12s | %12s | %11s | %12s | %-7s |\n", what, measured.c_str(), floor.c_str(),
+                    value.c_str(), goal.c_str(), verdict);
+    };
+    row("Figure", "Measured", "Floor", "Value", "Goal", "Verdict");
+    std::printf("|:%s|%s:|%s:|%s:|%s:|:%s|\n", std::string(49, '-').c_str(), std::string(13, '-').c_str(),
+                std::string(13, '-').c_str(), std::string(12, '-').c_str(), std::string(13, '-').c_str(),
+                std::string(8, '-').c_str());
     for (const Figure& figure : figures)
-        std::printf("%-46s %14s %14s %12s %14s  %s\n", figure.what.c_str(), figure.measured.c_str(),
-                    figure.floor.c_str(), figure.value ? number(*figure.value, figure.unit).c_str() : "-",
-                    goalOf(figure).c_str(), figure.verdict());
+        row(figure.what.c_str(), figure.measured, figure.floor,
+            figure.value ? number(*figure.value, figure.unit) : std::string("-"), goalOf(figure), figure.verdict());
     std::printf("\n");
     for (const Figure& figure : figures)
         if (!figure.remark.empty())
-            std::printf("%s: %s\n", figure.what.c_str(), figure.remark.c_str());
+            std::printf("- %s: %s\n", figure.what.c_str(), figure.remark.c_str());
 }
 
 bool writeJson(const std::string& path, const Machine& machine, bool quick, const std::vector<Figure>& figures) {

@@ -102,7 +102,9 @@ std::uint32_t defaultUserOfClass(std::uint64_t number) {
     return ipc::isSystemClass(containerClass) ? ipc::systemUserId : currentMobileUser;
 }
 
-std::string uuidText(const std::array<std::uint8_t, 16>& uuid) { return ipc::uuidText(uuid); }
+std::string uuidText(const std::array<std::uint8_t, 16>& uuid) {
+    return ipc::uuidText(uuid);
+}
 
 Client::Client(std::unique_ptr<Connection> connection) : connection_(std::move(connection)) {}
 Client::Client(Client&&) noexcept = default;

@@ -41,7 +41,8 @@ sockaddr_un addressOf(const std::string& path, const std::string& name, int dire
     return address;
 }
 
-constexpr std::size_t replyBytesMax = std::size_t{1} << 30; // a list of every container of a large device takes a few MiB
+constexpr std::size_t replyBytesMax = std::size_t{1}
+                                      << 30; // a list of every container of a large device takes a few MiB
 
 } // namespace
 
@@ -80,8 +81,8 @@ Result<void> Client::Connection::waitFor(short events) {
         if (ready > 0)
             return {};
         if (ready == 0)
-            return fail(Error::Kind::timedOut, "zorvaned did not answer within " +
-                                                   std::to_string(timeoutMilliseconds_) + " ms");
+            return fail(Error::Kind::timedOut,
+                        "zorvaned did not answer within " + std::to_string(timeoutMilliseconds_) + " ms");
         if (errno != EINTR)
             return fail(Error::Kind::unreachable, withReason("cannot wait for zorvaned", errno));
     }
@@ -94,9 +95,8 @@ Result<std::uint64_t> Client::Connection::send(const plist::Dictionary& request)
     const std::size_t payloadBytes = frame.size() - ipc::frameHeaderBytes;
     if (payloadBytes > ipc::requestPayloadBytesMax)
         return fail(Error::Kind::protocol, "the request is too large");
-    const ipc::FrameHeader header{.payloadBytes = static_cast<std::uint32_t>(payloadBytes),
-                                  .flags = ipc::frameExpectsReply,
-                                  .id = ++lastId_};
+    const ipc::FrameHeader header{
+        .payloadBytes = static_cast<std::uint32_t>(payloadBytes), .flags = ipc::frameExpectsReply, .id = ++lastId_};
     ipc::encodeFrameHeader(header, std::span(frame).first<ipc::frameHeaderBytes>());
     for (std::size_t sent = 0; sent < frame.size();) {
         if (auto ready = waitFor(POLLOUT); !ready)
@@ -166,8 +166,7 @@ Result<plist::Dictionary> Client::Connection::call(const plist::Dictionary& requ
     if (!code)
         return fail(Error::Kind::protocol, "the reply has no \"ReplyError\"");
     if (*code != ipc::replySuccess)
-        return std::unexpected(
-            Error{.kind = Error::Kind::daemon, .code = *code, .message = errorText(*code).meaning});
+        return std::unexpected(Error{.kind = Error::Kind::daemon, .code = *code, .message = errorText(*code).meaning});
     return reply;
 }
 

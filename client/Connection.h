@@ -21,8 +21,8 @@ public:
     enum class Service { commands, status };
     [[nodiscard]] static Result<Connection> open(const ConnectOptions& options, Service service);
 
-    /// Sends a request and waits for its reply; a "ReplyError" other than success is the error. Replies to other requests that
-    /// come first are kept.
+    /// Sends a request and waits for its reply; a "ReplyError" other than success is the error. Replies to other
+    /// requests that come first are kept.
     [[nodiscard]] Result<zor::plist::Dictionary> call(const zor::plist::Dictionary& request);
     /// The next frame, whatever its id.
     struct Reply {

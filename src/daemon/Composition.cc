@@ -4,8 +4,7 @@
 namespace zor {
 
 Composition::Composition(platform::Platform platform, fs::Durability::Probe probe)
-    : platform_(platform), log_(platform.log),
-      refusals_([this](uid_t uid, std::uint64_t linesLeftOut) {
+    : platform_(platform), log_(platform.log), refusals_([this](uid_t uid, std::uint64_t linesLeftOut) {
           log_.write(logLevelNotice, "RefusalLimiter", "Left out %llu refusals of user %u",
                      static_cast<unsigned long long>(linesLeftOut), uid);
       }),
@@ -45,14 +44,24 @@ Composition::Late& Composition::late() {
     return *late_;
 }
 
-StoreServices& Composition::store() { return late().services; }
+StoreServices& Composition::store() {
+    return late().services;
+}
 
-Dispatcher& Composition::dispatcher() { return late().dispatcher; }
+Dispatcher& Composition::dispatcher() {
+    return late().dispatcher;
+}
 
-const std::shared_ptr<ZORClientConnection>& Composition::sharedClientConnection() { return late().sharedClient; }
+const std::shared_ptr<ZORClientConnection>& Composition::sharedClientConnection() {
+    return late().sharedClient;
+}
 
-ZOREntitlementMapping& Composition::entitlements() { return late().entitlements; }
+ZOREntitlementMapping& Composition::entitlements() {
+    return late().entitlements;
+}
 
-const ZORWhitelist& Composition::whitelist() { return late().whitelist; }
+const ZORWhitelist& Composition::whitelist() {
+    return late().whitelist;
+}
 
 } // namespace zor

@@ -1,8 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
-// The composition root: every service, made once and in the order of what it calls, over one platform and one system root.
+// The composition root: every service, made once and in the order of what it calls, over one platform and one system
+// root.
 //
-// Nothing below this reaches for a process-wide object; what is shared is handed down by reference. So a second daemon, or a test
-// with its own root, can live in the same process. Destruction goes the other way round.
+// Nothing below this reaches for a process-wide object; what is shared is handed down by reference. So a second daemon,
+// or a test with its own root, can live in the same process. Destruction goes the other way round.
 #pragma once
 
 #include "daemon/Dispatcher.h"
@@ -29,8 +30,7 @@ namespace zor {
 class Composition {
 public:
     /// `probe` says how a file system orders what is not synced; tests put their own in its place.
-    explicit Composition(platform::Platform platform,
-                         fs::Durability::Probe probe = fs::orderingOfFileSystem);
+    explicit Composition(platform::Platform platform, fs::Durability::Probe probe = fs::orderingOfFileSystem);
     Composition(const Composition&) = delete;
     Composition& operator=(const Composition&) = delete;
 
@@ -39,8 +39,8 @@ public:
     [[nodiscard]] ZORFileManager& defaultManager() { return fileManager_; }
     [[nodiscard]] ZORGlobalConfiguration& configuration() { return configuration_; }
 
-    // Made when they are first asked for: reading the entitlement file belongs to the start of the work, after the log is
-    // open. Not before the log is; the first call is made by the thread that starts the daemon.
+    // Made when they are first asked for: reading the entitlement file belongs to the start of the work, after the log
+    // is open. Not before the log is; the first call is made by the thread that starts the daemon.
     [[nodiscard]] StoreServices& store();
     [[nodiscard]] Dispatcher& dispatcher();
     /// The daemon's own client.

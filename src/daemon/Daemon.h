@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // The daemon's life: start-up in its fixed order, the lock-state follower, and the run loop.
 //
-// Runs on the main thread. Before the listener is made, no client is served; the setup is alone with the disk. A stop during
-// start-up leaves what the setup's own steps leave, and the next launch begins anew.
+// Runs on the main thread. Before the listener is made, no client is served; the setup is alone with the disk. A stop
+// during start-up leaves what the setup's own steps leave, and the next launch begins anew.
 #pragma once
 
 #include "daemon/Composition.h"

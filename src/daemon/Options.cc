@@ -44,9 +44,12 @@ bool parseLevel(const char* text, int& level) {
 
 std::expected<DaemonOptions, OptionsEnd> parseDaemonOptions(int argumentCount, char** arguments) {
     static constexpr option known[] = {
-        {"root", required_argument, nullptr, 'r'},   {"foreground", no_argument, nullptr, 'f'},
-        {"log-level", required_argument, nullptr, 'l'}, {"forget-boot", no_argument, nullptr, 'b'},
-        {"help", no_argument, nullptr, 'h'},         {"version", no_argument, nullptr, 'v'},
+        {"root", required_argument, nullptr, 'r'},
+        {"foreground", no_argument, nullptr, 'f'},
+        {"log-level", required_argument, nullptr, 'l'},
+        {"forget-boot", no_argument, nullptr, 'b'},
+        {"help", no_argument, nullptr, 'h'},
+        {"version", no_argument, nullptr, 'v'},
         {nullptr, 0, nullptr, 0},
     };
     DaemonOptions options;

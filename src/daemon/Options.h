@@ -14,7 +14,8 @@ struct DaemonOptions {
     bool forgetBoot = false;
 };
 
-/// Why the daemon does not start from this command line: a text to show and the exit status (0 for --help and --version).
+/// Why the daemon does not start from this command line: a text to show and the exit status (0 for --help and
+/// --version).
 struct OptionsEnd {
     std::string text;
     int exitStatus = 0;

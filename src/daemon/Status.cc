@@ -34,7 +34,8 @@ plist::Dictionary describe(const platform::Identity& identity) {
 } // namespace
 
 plist::Dictionary Status::forPeer(platform::Peer& peer) {
-    plist::Dictionary status{{std::string(ipc::keys::statusPeer), describe(peer.identify(platform::Peer::Explain::yes))}};
+    plist::Dictionary status{
+        {std::string(ipc::keys::statusPeer), describe(peer.identify(platform::Peer::Explain::yes))}};
     if (composition_.platform().peers.ownsRoot(peer.kernelUserId()))
         status.set(ipc::keys::statusCounters, counters());
     return status;

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the status socket tells: to every peer, whom the daemon takes it for and why; to the owners of the root, also how the
-// daemon is doing.
+// What the status socket tells: to every peer, whom the daemon takes it for and why; to the owners of the root, also
+// how the daemon is doing.
 #pragma once
 
 #include "daemon/Composition.h"

@@ -1,10 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 // The client of one message, and the container operations made in its name.
 //
-// One object a message, always held by a shared_ptr; the daemon's own (identifier "com.veltra.zorvaned.internal") lives as long as the daemon. Operations
-// may be called from any thread; which locks they take and when is said at each. Errors are logged where they are made, and
-// every operation a command calls ends exceptions at its boundary (code 40). Nothing is deleted in place: what goes away moves to
-// death row, and the death-row queue removes it later.
+// One object a message, always held by a shared_ptr; the daemon's own (identifier "com.veltra.zorvaned.internal") lives
+// as long as the daemon. Operations may be called from any thread; which locks they take and when is said at each.
+// Errors are logged where they are made, and every operation a command calls ends exceptions at its boundary (code 40).
+// Nothing is deleted in place: what goes away moves to death row, and the death-row queue removes it later.
 //
 // The operations are written in src/store/operations/, a source for each family.
 #pragma once
@@ -29,8 +29,8 @@ struct StoreServices;
 enum class UseLocking { no, yes };
 enum class StartDeletionThread { no, yes };
 
-/// A container as an operation found or made it. What a reply needs of the record was read while the operation still held its
-/// lock, so one client never sees what another's request made of the shared record meanwhile.
+/// A container as an operation found or made it. What a reply needs of the record was read while the operation still
+/// held its lock, so one client never sees what another's request made of the shared record meanwhile.
 struct FoundContainer {
     std::shared_ptr<ZORMetadata> record;
     UUID uuid;
@@ -61,8 +61,8 @@ public:
         bool transient = false;
         UseLocking useLocking = UseLocking::yes;
     };
-    /// The container of (user, identifier, class), created if asked. With locking it runs under the all-identifiers lock
-    /// held for writing. `identifier` nullptr: error 11.
+    /// The container of (user, identifier, class), created if asked. With locking it runs under the all-identifiers
+    /// lock held for writing. `identifier` nullptr: error 11.
     Result<FoundContainer> createOrLookupContainerForUser(std::uint32_t userId, const std::string* identifier,
                                                           ContainerClass containerClass,
                                                           const CreateOrLookupOptions& options);

@@ -196,7 +196,8 @@ bool ZOREntitlementMapping::identifierHasSystemContainer(std::string_view identi
     return _onQueue_identifierHasSystemContainer(identifier);
 }
 
-ZOREntitlementMapping::Identifiers ZOREntitlementMapping::appGroupIdentifiersForIdentifier(std::string_view identifier) {
+ZOREntitlementMapping::Identifiers
+ZOREntitlementMapping::appGroupIdentifiersForIdentifier(std::string_view identifier) {
     const MutexLock held(entitlementQueue_);
     return _onQueue_appGroupIdentifiersForIdentifier(identifier);
 }

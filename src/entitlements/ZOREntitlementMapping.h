@@ -1,12 +1,12 @@
 // SPDX-License-Identifier: Apache-2.0
 // What each identifier is entitled to: the persistent map from which every decision about shared containers is made.
 //
-// One file, loaded once, written whole after each change. The map is touched only on the entitlement queue, which public
-// operations enter synchronously; it is a mutex here, since nothing ever runs on it by itself. Operations whose names begin with
-// _onQueue_ run inside it and never enter it again.
+// One file, loaded once, written whole after each change. The map is touched only on the entitlement queue, which
+// public operations enter synchronously; it is a mutex here, since nothing ever runs on it by itself. Operations whose
+// names begin with _onQueue_ run inside it and never enter it again.
 //
-// A stop during a save leaves the old file or the new one. A file that is there but cannot be read is moved aside, never
-// written over: as long as it lies there, nothing may be deleted because the map does not mention it (lostFile).
+// A stop during a save leaves the old file or the new one. A file that is there but cannot be read is moved aside,
+// never written over: as long as it lies there, nothing may be deleted because the map does not mention it (lostFile).
 #pragma once
 
 #include "daemon/base/Result.h"
@@ -55,9 +55,9 @@ public:
     [[nodiscard]] Identifiers systemGroupIdentifiersForIdentifier(std::string_view identifier)
         ZOR_EXCLUDES(entitlementQueue_);
 
-    /// Stores a value under each key (an empty dictionary removes the key) and saves once, when anything changed. Error 60
-    /// when the counts differ, 59 when the save fails: the map in memory then keeps the change, and the next call saves it
-    /// even when it changes nothing.
+    /// Stores a value under each key (an empty dictionary removes the key) and saves once, when anything changed. Error
+    /// 60 when the counts differ, 59 when the save fails: the map in memory then keeps the change, and the next call
+    /// saves it even when it changes nothing.
     Result<void> _setEntitlementDictionaryValues(const std::vector<plist::Dictionary>& values,
                                                  const std::vector<std::string>& identifiers)
         ZOR_EXCLUDES(entitlementQueue_);
@@ -93,7 +93,8 @@ private:
     const FileURL entitlementMappingFileUrl_;
     platform::Mutex entitlementQueue_;
     plist::Dictionary entitlementMappingDict_ ZOR_GUARDED_BY(entitlementQueue_);
-    /// The last save failed: the map is ahead of the file, and no change may be answered with success before one succeeds.
+    /// The last save failed: the map is ahead of the file, and no change may be answered with success before one
+    /// succeeds.
     bool unsaved_ ZOR_GUARDED_BY(entitlementQueue_) = false;
 };
 

@@ -21,13 +21,14 @@ bool isDirectoryName(const std::string& name) {
     return !name.empty() && name.size() <= nameBytesMax && name[0] != '.' && name.find('/') == std::string::npos;
 }
 
-ZORWhitelist::Mapping builtInSystemContainers() { return {{"com.veltra.settingsd", "com.veltra.settingsd"}}; }
+ZORWhitelist::Mapping builtInSystemContainers() {
+    return {{"com.veltra.settingsd", "com.veltra.settingsd"}};
+}
 
 ZORWhitelist::Mapping builtInSystemGroups() {
     ZORWhitelist::Mapping mapping;
-    for (const char* identifier :
-         {"systemgroup.com.veltra.fonts", "systemgroup.com.veltra.timezone", "systemgroup.com.veltra.certificates",
-          "systemgroup.com.veltra.dictionaries"})
+    for (const char* identifier : {"systemgroup.com.veltra.fonts", "systemgroup.com.veltra.timezone",
+                                   "systemgroup.com.veltra.certificates", "systemgroup.com.veltra.dictionaries"})
         mapping.emplace(identifier, identifier);
     return mapping;
 }

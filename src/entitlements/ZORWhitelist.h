@@ -21,8 +21,8 @@ public:
     /// initWithSystemContainerMapping:systemGroupContainerMapping:
     ZORWhitelist(Mapping systemContainers, Mapping systemGroupContainers)
         : systemWhitelist_(std::move(systemContainers)), systemGroupWhitelist_(std::move(systemGroupContainers)) {}
-    /// The tables of DIR/etc/zorvane/wellknown.plist where that file stands, else the built-in ones. A file that cannot be
-    /// used, or a row in it, is said in the log and left out.
+    /// The tables of DIR/etc/zorvane/wellknown.plist where that file stands, else the built-in ones. A file that cannot
+    /// be used, or a row in it, is said in the log and left out.
     static ZORWhitelist forSystem(const Log& log, ZORFileManager& fileManager);
 
     [[nodiscard]] const Mapping& systemWhitelist() const { return systemWhitelist_; }

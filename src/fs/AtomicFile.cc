@@ -20,7 +20,9 @@ namespace {
 constexpr std::size_t randomCharacters = 6;
 constexpr int namesTriedMax = 16;
 
-std::string temporaryPrefix(const std::string& name) { return "." + name + ".new-"; }
+std::string temporaryPrefix(const std::string& name) {
+    return "." + name + ".new-";
+}
 
 /// What stops before their rename left of earlier writes of the same target.
 void removeLeftovers(platform::Disk& disk, int directory, const std::string& prefix) {

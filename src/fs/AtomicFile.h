@@ -1,9 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 // Replacing a file in one step: the old content or the new one, whole, whenever somebody looks or the power goes.
 //
-// A temporary file ("." and a random name) in the same directory is written and synced, renamed over the target, and the
-// directory is synced. A stop before the rename leaves the temporary file, which no listing shows; the next write of the same
-// target removes what earlier stops left of it. Any thread; writers of one target are serialised by their callers.
+// A temporary file ("." and a random name) in the same directory is written and synced, renamed over the target, and
+// the directory is synced. A stop before the rename leaves the temporary file, which no listing shows; the next write
+// of the same target removes what earlier stops left of it. Any thread; writers of one target are serialised by their
+// callers.
 #pragma once
 
 #include "platform/Disk.h"
@@ -20,8 +21,8 @@ namespace zor::fs {
 [[nodiscard]] int replaceFileDurably(platform::Disk& disk, int directory, const std::string& name, mode_t mode,
                                      std::span<const std::uint8_t> bytes);
 
-/// A new file with the content, not synced. Its descriptor, or a negative errno with nothing left behind but perhaps the
-/// file.
+/// A new file with the content, not synced. Its descriptor, or a negative errno with nothing left behind but perhaps
+/// the file.
 [[nodiscard]] int writeNewFile(platform::Disk& disk, int directory, const char* name, mode_t mode,
                                std::span<const std::uint8_t> bytes);
 

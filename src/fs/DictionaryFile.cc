@@ -19,12 +19,11 @@ Result<void> writeToURL(const plist::Dictionary& dictionary, const FileURL& url,
         return posixError(ZOR_HERE, EINVAL, "write of %s failed: options 0x%x are not offered", url.c_str(), options);
     const auto bytes = plist::writeBinary(dictionary);
     if (!bytes)
-        return posixError(ZOR_HERE, EINVAL, "serialisation for %s failed: %s", url.c_str(),
-                          bytes.error().reason);
+        return posixError(ZOR_HERE, EINVAL, "serialisation for %s failed: %s", url.c_str(), bytes.error().reason);
     const auto parent = fileManager.resolver().openParent(url);
-    const int status = parent ? fs::replaceFileDurably(fileManager.disk(), parent->directory.get(), parent->name, 0644,
-                                                       *bytes)
-                              : -parent.error();
+    const int status =
+        parent ? fs::replaceFileDurably(fileManager.disk(), parent->directory.get(), parent->name, 0644, *bytes)
+               : -parent.error();
     if (status < 0)
         return posixError(ZOR_HERE, -status, "write of %s failed: %s", url.c_str(), errorText(-status));
     return {};
@@ -45,9 +44,13 @@ Result<plist::Dictionary> readDictionaryAtURL(const FileURL& url, std::size_t by
     return std::move(*dictionary);
 }
 
-std::string stringWithFileSystemRepresentation(const char* bytes, std::size_t length) { return {bytes, length}; }
+std::string stringWithFileSystemRepresentation(const char* bytes, std::size_t length) {
+    return {bytes, length};
+}
 
-std::string stringWithFileSystemRepresentation(const char* bytes) { return {bytes, std::strlen(bytes)}; }
+std::string stringWithFileSystemRepresentation(const char* bytes) {
+    return {bytes, std::strlen(bytes)};
+}
 
 bool containsDotDotPathComponents(std::string_view path) {
     while (!path.empty()) {

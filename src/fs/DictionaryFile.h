@@ -21,8 +21,8 @@ inline constexpr std::uint32_t writeWithoutProtection = 0x10000000;
 Result<void> writeToURL(const plist::Dictionary& dictionary, const FileURL& url, std::uint32_t options,
                         ZORFileManager& fileManager);
 
-/// A dictionary from a file that only the daemon can have written, in either property-list form. POSIX error: ENOENT when
-/// there is none, EINVAL when it is no dictionary.
+/// A dictionary from a file that only the daemon can have written, in either property-list form. POSIX error: ENOENT
+/// when there is none, EINVAL when it is no dictionary.
 Result<plist::Dictionary> readDictionaryAtURL(const FileURL& url, std::size_t bytesMax, ZORFileManager& fileManager);
 
 /// Bytes of a path as a string: what is not UTF-8 stays as it is, for names are bytes.

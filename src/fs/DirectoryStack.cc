@@ -72,7 +72,9 @@ bool DirectoryStack::ensureParent(std::size_t& levelsLost) {
     if (levels_.size() < 2 || parent() >= 0)
         return true;
     const std::size_t above = levels_.size() - 2;
-    FileDescriptor directory(::openat(top(), "..", O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    FileDescriptor directory;
+    if (const int below = top(); below >= 0)
+        directory.reset(::openat(below, "..", O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
     if (directory.valid() && isLevel(directory.get(), above)) {
         install(above, std::move(directory));
         return true;

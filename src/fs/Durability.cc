@@ -36,8 +36,8 @@ std::string ext4Options(dev_t device) {
     return options;
 }
 
-/// Only what the driver says counts: without a journal it names no data mode, and without barriers the device's cache is
-/// not flushed. ext2 and ext3 disks come out right too, since it is the same driver that speaks.
+/// Only what the driver says counts: without a journal it names no data mode, and without barriers the device's cache
+/// is not flushed. ext2 and ext3 disks come out right too, since it is the same driver that speaks.
 bool hasOrderedJournal(dev_t device) {
     const std::string options = ext4Options(device);
     const auto has = [&](const char* option) { return options.find(option) != std::string::npos; };
@@ -48,8 +48,8 @@ bool hasOrderedJournal(dev_t device) {
 } // namespace
 
 Ordering orderingOfFileSystem(int fd) {
-    struct statfs fileSystem {};
-    struct stat status {};
+    struct statfs fileSystem{};
+    struct stat status{};
     if (::fstatfs(fd, &fileSystem) != 0 || ::fstat(fd, &status) != 0)
         return Ordering::none;
     if (fileSystem.f_type == xfsMagic)
@@ -60,7 +60,7 @@ Ordering orderingOfFileSystem(int fd) {
 }
 
 Ordering Durability::ordering(int fd) const {
-    struct stat status {};
+    struct stat status{};
     if (::fstat(fd, &status) != 0)
         return Ordering::none;
     const platform::MutexLock held(mutex_);

@@ -1,13 +1,14 @@
 // SPDX-License-Identifier: Apache-2.0
 // What makes a change survive a power cut, on the file system that it is made on.
 //
-// A new container is built in staging and becomes visible with one move. Two things must hold: when the move is on the disk,
-// so is all that it moved; and when the client has its answer, the move is on the disk.
+// A new container is built in staging and becomes visible with one move. Two things must hold: when the move is on the
+// disk, so is all that it moved; and when the client has its answer, the move is on the disk.
 //
-// - ext4 with an ordered journal, and XFS, commit changes of names and inodes in the order in which they were made. There
-//   it is enough to write the new file's data out before the move (beforeMove), and to sync the destination directory once
-//   after it (afterMove): that one sync commits everything before it. It runs outside the store's locks, and those of
-//   concurrent creators share a commit.
+// - ext4 with an ordered journal, and XFS, commit changes of names and inodes in the order in which they were made.
+// There
+//   it is enough to write the new file's data out before the move (beforeMove), and to sync the destination directory
+//   once after it (afterMove): that one sync commits everything before it. It runs outside the store's locks, and those
+//   of concurrent creators share a commit.
 // - Any other file system promises no such order, so the whole file system is synced before the move and after it.
 //
 // Which kind a directory lies on is asked once for each device. Any thread.
@@ -32,11 +33,11 @@ public:
     using Probe = Ordering (*)(int fd);
     explicit Durability(platform::Disk& disk, Probe probe = orderingOfFileSystem) : disk_(disk), probe_(probe) {}
 
-    /// Before a tree of new directories and small new files is moved into view. `file` is a new file in the tree whose data
-    /// counts. 0 or a negative errno.
+    /// Before a tree of new directories and small new files is moved into view. `file` is a new file in the tree whose
+    /// data counts. 0 or a negative errno.
     [[nodiscard]] int beforeMove(int file) const;
-    /// After things were moved to a directory to be removed there, before they are: else a cut could leave the removal and
-    /// undo the move. 0 or a negative errno.
+    /// After things were moved to a directory to be removed there, before they are: else a cut could leave the removal
+    /// and undo the move. 0 or a negative errno.
     [[nodiscard]] int beforeRemoval(int directory) const;
     /// After the move, before it is acknowledged; needs no lock. `directory` is where the name came to be.
     [[nodiscard]] int afterMove(int directory) const;

@@ -26,7 +26,7 @@ std::expected<plist::Data, int> readOwnedFile(int directory, const char* path, s
     const auto file = platform::openBeneath(directory, path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
     if (!file)
         return std::unexpected(file.error());
-    struct stat status {};
+    struct stat status{};
     if (::fstat(file->get(), &status) != 0)
         return std::unexpected(errno);
     if (const int refused = judge(status, bytesMax))
@@ -52,7 +52,7 @@ int isRegularFile(int directory, const char* path) {
     const auto item = platform::openBeneath(directory, path, O_PATH | O_NOFOLLOW);
     if (!item)
         return item.error();
-    struct stat status {};
+    struct stat status{};
     if (::fstat(item->get(), &status) != 0)
         return errno;
     return S_ISREG(status.st_mode) ? 0 : EINVAL;

@@ -31,9 +31,13 @@ OpenResult PathResolver::openItem(const FileURL& url, int flags) const {
     return openBeneath(root_.descriptor(), path, flags | O_NOFOLLOW);
 }
 
-OpenResult PathResolver::openDirectory(const FileURL& url) const { return openItem(url, O_RDONLY | O_DIRECTORY); }
+OpenResult PathResolver::openDirectory(const FileURL& url) const {
+    return openItem(url, O_RDONLY | O_DIRECTORY);
+}
 
-OpenResult PathResolver::openDirectoryPath(const FileURL& url) const { return openItem(url, O_PATH | O_DIRECTORY); }
+OpenResult PathResolver::openDirectoryPath(const FileURL& url) const {
+    return openItem(url, O_PATH | O_DIRECTORY);
+}
 
 std::expected<ParentAndName, int> PathResolver::openParent(const FileURL& url) const {
     OpenResult directory = openDirectoryPath(url.deletingLastPathComponent());

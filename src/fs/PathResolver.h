@@ -1,9 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 // From a path to a descriptor, without following anything.
 //
-// Below a user's home every name can change between two system calls. So a path is resolved once, from the open root, in one
-// openat2 that follows no link and leaves no root; what comes after acts on the descriptor. A path outside the root, a link
-// on the way, or a "..", is an error, never a detour. All functions return a descriptor or an errno. Any thread.
+// Below a user's home every name can change between two system calls. So a path is resolved once, from the open root,
+// in one openat2 that follows no link and leaves no root; what comes after acts on the descriptor. A path outside the
+// root, a link on the way, or a "..", is an error, never a detour. All functions return a descriptor or an errno. Any
+// thread.
 #pragma once
 
 #include "daemon/base/FileURL.h"

@@ -21,20 +21,21 @@ constexpr int namesTriedMax = 16;
 
 Result<void> ZORFileManager::createDirectoryAtURL(const FileURL& url, Intermediates intermediates,
                                                   const DirectoryAttributes& attributes) {
-    struct stat status {};
+    struct stat status{};
     const int failure = resolver_.status(url, status);
     if (failure != 0 && failure != ENOENT)
         return posixError(ZOR_HERE, failure, "Failed to determine if %s exists: %s", url.c_str(), errorText(failure));
     if (failure == ENOENT)
         return makeNewDirectory(url, intermediates, attributes);
     if (!S_ISDIR(status.st_mode)) {
-        // Changing the attributes of whatever stands there instead, perhaps through a link, would be acting on another's file.
+        // Changing the attributes of whatever stands there instead, perhaps through a link, would be acting on
+        // another's file.
         const int number = S_ISLNK(status.st_mode) ? ELOOP : ENOTDIR;
         return posixError(ZOR_HERE, number, "%s of %s failed: %s",
                           intermediates == Intermediates::yes ? "dirchain" : "mkdir", url.c_str(), errorText(number));
     }
-    const bool ownerFits = attributes.owner == ownerUnchanged ||
-                           (status.st_uid == attributes.owner && status.st_gid == attributes.owner);
+    const bool ownerFits =
+        attributes.owner == ownerUnchanged || (status.st_uid == attributes.owner && status.st_gid == attributes.owner);
     if (attributes.protectionClass == protectionClassUnchanged && ownerFits &&
         (status.st_mode & 07777) == attributes.mode)
         return {};
@@ -67,8 +68,8 @@ Result<void> ZORFileManager::makeNewDirectory(const FileURL& url, Intermediates 
     TRY(applyAttributes(parent->get(), name, temporaryPath, attributes));
     const int renamed = disk_.rename(parent->get(), name.c_str(), parent->get(), finalName.c_str(), 0);
     if (renamed < 0)
-        return posixError(ZOR_HERE, -renamed, "failed to rename from %s to %s : %s", temporaryPath.c_str(),
-                          url.c_str(), errorText(-renamed));
+        return posixError(ZOR_HERE, -renamed, "failed to rename from %s to %s : %s", temporaryPath.c_str(), url.c_str(),
+                          errorText(-renamed));
     return {};
 }
 
@@ -84,13 +85,12 @@ Result<void> ZORFileManager::applyAttributes(int parent, const std::string& name
             return posixError(ZOR_HERE, failure, "Failed to setclass(%d) on directory %s: %s",
                               attributes.protectionClass, path.c_str(), errorText(failure));
     }
-    struct stat status {};
+    struct stat status{};
     if (::fstat(directory->get(), &status) != 0)
         return posixError(ZOR_HERE, errno, "opendir of %s failed: %s", path.c_str(), errorText(errno));
     if ((status.st_mode & 07777) != attributes.mode)
         disk_.changeMode(directory->get(), attributes.mode);
-    if (attributes.owner != ownerUnchanged &&
-        (status.st_uid != attributes.owner || status.st_gid != attributes.owner))
+    if (attributes.owner != ownerUnchanged && (status.st_uid != attributes.owner || status.st_gid != attributes.owner))
         disk_.changeOwner(directory->get(), attributes.owner, attributes.owner);
     return {};
 }
@@ -108,8 +108,7 @@ int ZORFileManager::setClassAtCreation(int directory, int protectionClass) {
     return 0;
 }
 
-Result<FileURL> ZORFileManager::createTemporaryDirectoryInDirectoryURL(const FileURL& directory,
-                                                                       std::uint32_t owner) {
+Result<FileURL> ZORFileManager::createTemporaryDirectoryInDirectoryURL(const FileURL& directory, std::uint32_t owner) {
     const auto parent = resolver_.openDirectoryPath(directory);
     std::string name;
     int made = parent ? -EEXIST : -parent.error();
@@ -128,7 +127,7 @@ Result<FileURL> ZORFileManager::createTemporaryDirectoryInDirectoryURL(const Fil
 }
 
 bool ZORFileManager::itemExistsAtURL(const FileURL& url) {
-    struct stat status {};
+    struct stat status{};
     const int failure = resolver_.status(url, status);
     if (failure != 0 && failure != ENOENT)
         log_.write(logLevelError, __func__, "Failed to determine if %s exists: %s", url.c_str(), errorText(failure));
@@ -136,7 +135,7 @@ bool ZORFileManager::itemExistsAtURL(const FileURL& url) {
 }
 
 bool ZORFileManager::itemDoesNotExistAtURL(const FileURL& url) {
-    struct stat status {};
+    struct stat status{};
     const int failure = resolver_.status(url, status);
     if (failure != 0 && failure != ENOENT)
         log_.write(logLevelError, __func__, "Failed to determine if %s exists: %s", url.c_str(), errorText(failure));

@@ -1,13 +1,14 @@
 // SPDX-License-Identifier: Apache-2.0
 // The one place where the daemon creates, moves, copies, removes, lists, re-owns and measures directories.
 //
-// It has no state and no lock; any thread may call any operation. Paths are resolved anew by each call without following a
-// link (PathResolver), everything after that acts on descriptors: what a path names may change at any moment, what a
-// descriptor names may not. Failures are POSIX-domain errors that carry the words below and are not logged here; whoever
-// returns them to a client logs.
+// It has no state and no lock; any thread may call any operation. Paths are resolved anew by each call without
+// following a link (PathResolver), everything after that acts on descriptors: what a path names may change at any
+// moment, what a descriptor names may not. Failures are POSIX-domain errors that carry the words below and are not
+// logged here; whoever returns them to a client logs.
 //
 // What a stop in the middle leaves: of a new directory, a sibling named "NAME.XXXXXX"; of a move across file systems, a
-// hidden ".zorvaned-copy-XXXXXX" beside the destination or where the source was. Neither is ever taken for the real thing.
+// hidden ".zorvaned-copy-XXXXXX" beside the destination or where the source was. Neither is ever taken for the real
+// thing.
 #pragma once
 
 #include "daemon/base/FileURL.h"
@@ -47,8 +48,8 @@ public:
     ZORFileManager(const ZORFileManager&) = delete;
     ZORFileManager& operator=(const ZORFileManager&) = delete;
 
-    // Creation. An existing directory gets its attributes again and counts as created; a new one comes into existence under
-    // its final name only with them.
+    // Creation. An existing directory gets its attributes again and counts as created; a new one comes into existence
+    // under its final name only with them.
     Result<void> createDirectoryAtURL(const FileURL& url, Intermediates intermediates,
                                       const DirectoryAttributes& attributes);
     /// A new directory "temp." and six characters, mode 0700.
@@ -66,7 +67,8 @@ public:
 
     // Walking and listing.
     /// Every entry of the tree to the visitor, directories before and after what they hold.
-    Result<void> _traverseDirectory(const FileURL& url, const std::function<Result<void>(const fs::WalkEntry&)>& visitor);
+    Result<void> _traverseDirectory(const FileURL& url,
+                                    const std::function<Result<void>(const fs::WalkEntry&)>& visitor);
     /// Owner of everything but metadata files; 0755 for directories and what has an execute bit, else 0644.
     Result<void> standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid);
     /// The entries whose names do not begin with ".", in the directory's order.

@@ -3,11 +3,11 @@
 #include "fs/AtomicFile.h"
 #include "fs/BulkDirectoryRead.h"
 #include "fs/DiskUsage.h"
+#include "fs/MetadataFileName.h"
 #include "fs/RecursiveCopy.h"
 #include "fs/RecursiveRemove.h"
 #include "fs/ZORFileManager.h"
 #include "platform/linux/Openat2.h"
-#include "fs/MetadataFileName.h"
 
 #include <cerrno>
 #include <dirent.h>
@@ -29,7 +29,9 @@ std::string below(const FileURL& root, const std::string& relative) {
 }
 
 /// 0755 for directories and whatever somebody may execute, else 0644.
-mode_t standardMode(mode_t mode) { return S_ISDIR(mode) || (mode & 0111) ? 0755 : 0644; }
+mode_t standardMode(mode_t mode) {
+    return S_ISDIR(mode) || (mode & 0111) ? 0755 : 0644;
+}
 
 } // namespace
 
@@ -93,7 +95,7 @@ Result<void> ZORFileManager::moveItemIfExistsAtURL(const FileURL& source, const 
 }
 
 Result<bool> ZORFileManager::sourceIsMissing(const FileURL& source) {
-    struct stat status {};
+    struct stat status{};
     const int failure = resolver_.status(source, status);
     if (failure != 0 && failure != ENOENT)
         return posixError(ZOR_HERE, failure, "stat of %s failed: %s", source.c_str(), errorText(failure));
@@ -136,10 +138,10 @@ Result<void> ZORFileManager::_moveItemAtURL(const FileURL& source, const FileURL
         return {};
     const auto from = resolver_.openParent(source);
     const auto to = resolver_.openParent(destination);
-    const int status = !from ? -from.error()
-                       : !to ? -to.error()
-                             : disk_.rename(from->directory.get(), from->name.c_str(), to->directory.get(),
-                                            to->name.c_str(), 0);
+    const int status =
+        !from ? -from.error()
+        : !to ? -to.error()
+              : disk_.rename(from->directory.get(), from->name.c_str(), to->directory.get(), to->name.c_str(), 0);
     if (status == -EXDEV && from && to)
         return moveAcrossFileSystems(source, destination);
     if (status < 0)
@@ -205,7 +207,7 @@ Result<void> ZORFileManager::_traverseDirectory(const FileURL& url,
 void ZORFileManager::standardizeEntry(int parent, const char* name, const std::string& path, uid_t uid, gid_t gid) {
     constexpr const char* function = "standardizeOwnershipAtURL";
     const auto item = platform::openBeneath(parent, name, O_PATH | O_NOFOLLOW);
-    struct stat status {};
+    struct stat status{};
     if (!item || ::fstat(item->get(), &status) != 0) {
         const int number = item ? errno : item.error();
         if (number != ENOENT)
@@ -233,7 +235,7 @@ Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t
         return {};
     });
     const auto parent = resolver_.openParent(url);
-    struct stat status {};
+    struct stat status{};
     const int failure = parent ? resolver_.status(url, status) : parent.error();
     if (failure != 0)
         return posixError(ZOR_HERE, failure, "Could not stat %s: %s", url.c_str(), errorText(failure));
@@ -261,7 +263,7 @@ Result<std::vector<FileURL>> ZORFileManager::urlsForItemsInDirectoryAtURL(const 
         if (entry->name[0] == '.')
             continue;
         unsigned char type = entry->type;
-        struct stat status {};
+        struct stat status{};
         if (type == DT_UNKNOWN && ::fstatat(opened->get(), entry->name, &status, AT_SYMLINK_NOFOLLOW) == 0)
             type = static_cast<unsigned char>(IFTODT(status.st_mode));
         urls.push_back(type == DT_DIR ? directory.appendingDirectory(entry->name)

@@ -7,8 +7,12 @@ namespace {
 thread_local BlockingObserver* threadObserver = nullptr;
 }
 
-void BlockingObserver::setForThisThread(BlockingObserver* observer) { threadObserver = observer; }
+void BlockingObserver::setForThisThread(BlockingObserver* observer) {
+    threadObserver = observer;
+}
 
-BlockingObserver* BlockingObserver::ofThisThread() { return threadObserver; }
+BlockingObserver* BlockingObserver::ofThisThread() {
+    return threadObserver;
+}
 
 } // namespace zor::platform

@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // Says that this thread is about to wait for something slow: a lock that is taken, a sync, the build of a large cache.
 //
-// The pool that serves clients keeps about as many threads running as there are processors. A thread that waits inside a
-// handler is not running, so the pool lets another one take its place while a scope is open. On a thread that belongs to no
-// pool a scope does nothing.
+// The pool that serves clients keeps about as many threads running as there are processors. A thread that waits inside
+// a handler is not running, so the pool lets another one take its place while a scope is open. On a thread that belongs
+// to no pool a scope does nothing.
 #pragma once
 
 namespace zor::platform {

@@ -45,7 +45,8 @@ public:
     // Data.
     /// Writes all of `bytes` at the descriptor's offset, or fails.
     virtual int write(int fd, std::span<const std::uint8_t> bytes) = 0;
-    /// Makes `to`, empty and new, share all data of `from` (FICLONE); -EOPNOTSUPP, -EXDEV, -EINVAL where that cannot be.
+    /// Makes `to`, empty and new, share all data of `from` (FICLONE); -EOPNOTSUPP, -EXDEV, -EINVAL where that cannot
+    /// be.
     virtual int cloneData(int from, int to) = 0;
     /// Copies up to `bytesMax` at both offsets (copy_file_range); the count copied, 0 at the end.
     virtual ssize_t copyData(int from, int to, std::size_t bytesMax) = 0;
@@ -55,8 +56,8 @@ public:
     virtual int sync(int fd) = 0;
     /// Everything of the file system that `fd` lies on.
     virtual int syncFileSystem(int fd) = 0;
-    /// Writes the file's data out and waits, so that on a file system with an ordered journal no later change can become
-    /// durable before it. Commits nothing by itself.
+    /// Writes the file's data out and waits, so that on a file system with an ordered journal no later change can
+    /// become durable before it. Commits nothing by itself.
     virtual int orderData(int fd) = 0;
 };
 

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// Mutexes that clang's thread-safety analysis understands. The lint build turns every access to guarded state outside its
-// lock into an error, so state is declared beside its mutex with ZOR_GUARDED_BY.
+// Mutexes that clang's thread-safety analysis understands. The lint build turns every access to guarded state outside
+// its lock into an error, so state is declared beside its mutex with ZOR_GUARDED_BY.
 #pragma once
 
 #include <chrono>

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// The set of platform roles that one daemon runs on. Every member may be replaced, which is how a test makes a world of its
-// own over a temporary root, or hands in a disk that fails.
+// The set of platform roles that one daemon runs on. Every member may be replaced, which is how a test makes a world of
+// its own over a temporary root, or hands in a disk that fails.
 #pragma once
 
 #include "platform/BootMarker.h"

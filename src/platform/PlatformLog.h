@@ -16,8 +16,8 @@ public:
     virtual bool open(std::string_view name, int level) = 0;
     [[nodiscard]] virtual bool isOpen() const = 0;
     [[nodiscard]] virtual int level() const = 0;
-    /// Sends lines to a file from now on. When a line would pass `fileBytesMax`, file is renamed to file.1, file.1 to file.2
-    /// and so on, `fileCount` files in all; with one file it is started anew.
+    /// Sends lines to a file from now on. When a line would pass `fileBytesMax`, file is renamed to file.1, file.1 to
+    /// file.2 and so on, `fileCount` files in all; with one file it is started anew.
     virtual void enableDiskLogging(const std::string& path, unsigned fileCount, std::size_t fileBytesMax) = 0;
     /// One event, one line: control characters other than a tab are escaped. Any thread.
     virtual void write(int level, std::string_view function, std::string_view message) = 0;

@@ -23,7 +23,8 @@ public:
 struct ServiceEvent {
     enum class Kind {
         message,
-        /// Something arrived that is no message: a header that is broken, a payload that is no dictionary. It has no reply.
+        /// Something arrived that is no message: a header that is broken, a payload that is no dictionary. It has no
+        /// reply.
         other,
         /// The connection has ended. The last event of a connection.
         invalid,

@@ -28,8 +28,8 @@ public:
     /// Binds the port under its service name. 0 or an errno; `checkInCallName` names the call that failed.
     virtual int checkIn() = 0;
     [[nodiscard]] virtual const char* checkInCallName() const = 0;
-    /// Serves packets on the loop: the handler returns the reply packet, empty for none. False when no source can be made;
-    /// `sourceCallName` then names the call.
+    /// Serves packets on the loop: the handler returns the reply packet, empty for none. False when no source can be
+    /// made; `sourceCallName` then names the call.
     virtual bool serve(RunLoop& loop, std::function<std::vector<std::uint8_t>(const UpcallPacket&)> handler) = 0;
     [[nodiscard]] virtual const char* sourceCallName() const = 0;
     /// The longest reply packet that the port can send; known once it is checked in. A longer one is dropped.

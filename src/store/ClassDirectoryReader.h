@@ -1,10 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 // Reads the metadata of every container in a class directory.
 //
-// Reading is one open, one fstat, one read and one close an entry. In a large directory a second thread takes every other
-// stretch of entries: when the directory is not in memory, two reads are under way at the disk instead of one, and when it
-// is, two processors parse. What is found is handed over in the directory's order all the same, so that of two containers with one
-// identifier the later listed counts.
+// Reading is one open, one fstat, one read and one close an entry. In a large directory a second thread takes every
+// other stretch of entries: when the directory is not in memory, two reads are under way at the disk instead of one,
+// and when it is, two processors parse. What is found is handed over in the directory's order all the same, so that of
+// two containers with one identifier the later listed counts.
 #pragma once
 
 #include "store/ZORMetadata.h"

@@ -16,9 +16,13 @@ using platform::MutexLock;
 
 namespace {
 
-const char* suffix(bool transient) { return transient ? "(transient)" : ""; }
+const char* suffix(bool transient) {
+    return transient ? "(transient)" : "";
+}
 
-long number(ContainerClass containerClass) { return static_cast<long>(containerClass); }
+long number(ContainerClass containerClass) {
+    return static_cast<long>(containerClass);
+}
 
 } // namespace
 
@@ -58,8 +62,8 @@ Result<ZORContainerCache::ClassCache> ZORContainerCache::readClassDirectory(cons
         record->setTransient(key.transient);
         store(cache, std::move(record));
     }));
-    // A daemon that was killed may have left containers here that are not on the disk yet; who finds one here is told that it
-    // exists.
+    // A daemon that was killed may have left containers here that are not on the disk yet; who finds one here is told
+    // that it exists.
     const auto opened = fileManager_.resolver().openDirectory(*directory);
     const int synced = opened ? durability_.afterMove(opened->get()) : -opened.error();
     if (synced < 0)
@@ -90,12 +94,13 @@ Result<ZORContainerCache::Record> ZORContainerCache::findRecord(const Key& key, 
 Result<void> ZORContainerCache::checkOnDisk(Here here, const Key& key, const ZORMetadata& record,
                                             const char* foundFormatPrefix) {
     if (!record.hasUrl())
-        return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes, "Cache: %s%s: nil URL from %s",
-                         className(key.containerClass), suffix(key.transient), "(null)");
+        return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
+                         "Cache: %s%s: nil URL from %s", className(key.containerClass), suffix(key.transient),
+                         "(null)");
     const FileURL file = record.url().appendingFile(names::metadataFile);
     // A link or anything else in the file's place is no metadata file: the owner of the container can put it there.
     const auto item = fileManager_.resolver().openItem(file, O_PATH);
-    struct stat status {};
+    struct stat status{};
     if (item && ::fstat(item->get(), &status) == 0 && S_ISREG(status.st_mode)) {
         traceIdentifier(here, key, foundFormatPrefix, record.identifier());
         return {};
@@ -171,8 +176,7 @@ Result<void> ZORContainerCache::addContainerMetadata(const Record& record, std::
         const Here here{"addContainerMetadata", __LINE__};
         if (!isValidClass(record->containerClass()))
             return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
-                             "Invalid Metadata Content Class: %lld",
-                             static_cast<long long>(record->containerClass()));
+                             "Invalid Metadata Content Class: %lld", static_cast<long long>(record->containerClass()));
         if (place.empty())
             return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes, "Invalid input: URL: %s",
                              "(null)");

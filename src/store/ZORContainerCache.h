@@ -1,12 +1,14 @@
 // SPDX-License-Identifier: Apache-2.0
 // Finds containers without scanning the disk: for each user, class and transient flag, the records by identifier.
 //
-// Such a class cache is built from disk when it is first needed and kept; only adding and removing change it, and the setup
-// drops all of them once, before the first client. The disk is the truth all the same: a lookup that returns a record has just
-// seen its metadata file. Code 21 is the one answer that means "does not exist"; every other failure means "not known".
+// Such a class cache is built from disk when it is first needed and kept; only adding and removing change it, and the
+// setup drops all of them once, before the first client. The disk is the truth all the same: a lookup that returns a
+// record has just seen its metadata file. Code 21 is the one answer that means "does not exist"; every other failure
+// means "not known".
 //
-// One mutex guards the class caches and is held while one is built; the checks on disk run after it is released. Who needs a
-// lookup and a later add to be one step holds the identifier locks around both. Exceptions end at these operations (code 40).
+// One mutex guards the class caches and is held while one is built; the checks on disk run after it is released. Who
+// needs a lookup and a later add to be one step holds the identifier locks around both. Exceptions end at these
+// operations (code 40).
 #pragma once
 
 #include "daemon/base/ContainerClass.h"

@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // Where everything lies that does not belong to one mobile user, and which class directory a container belongs to.
 //
-// A directory getter makes its directory on every call, so one that was moved away is there again at the next; it logs when
-// that fails and returns the place anyway. Whether a user may own a class is its callers' question.
+// A directory getter makes its directory on every call, so one that was moved away is there again at the next; it logs
+// when that fails and returns the place anyway. Whether a user may own a class is its callers' question.
 //
 // One recursive lock is held for a whole getter, directory creation included; it is taken before a per-user one.
 #pragma once

@@ -34,7 +34,9 @@ std::optional<std::uint64_t> integerBits(const plist::Value& value) {
     return std::nullopt;
 }
 
-std::string_view withoutLastComponent(std::string_view path) { return path.substr(0, path.rfind('/')); }
+std::string_view withoutLastComponent(std::string_view path) {
+    return path.substr(0, path.rfind('/'));
+}
 
 } // namespace
 

@@ -1,11 +1,11 @@
 // SPDX-License-Identifier: Apache-2.0
 // The record of one container, and the file in the container that it is read from and written to.
 //
-// The file is all that lasts; a record is its copy in memory plus where the container lies. Records in the cache are shared
-// between threads and have no lock: whoever changes one holds the identifier or all-identifiers lock of the operation, and what a
-// reply needs is read before that lock is released. There may be hundreds of thousands of records, so one holds no more
-// than its data: directories are shared between the records that lie in them, and a directory name that is a UUID is kept as
-// its 16 bytes.
+// The file is all that lasts; a record is its copy in memory plus where the container lies. Records in the cache are
+// shared between threads and have no lock: whoever changes one holds the identifier or all-identifiers lock of the
+// operation, and what a reply needs is read before that lock is released. There may be hundreds of thousands of
+// records, so one holds no more than its data: directories are shared between the records that lie in them, and a
+// directory name that is a UUID is kept as its 16 bytes.
 #pragma once
 
 #include "daemon/base/ContainerClass.h"
@@ -67,8 +67,8 @@ public:
     void setTransient(bool transient) { transient_ = transient; }
     [[nodiscard]] bool existed() const { return existed_; }
     void setExisted(bool existed) { existed_ = existed; }
-    /// False from its creation until the move into its class directory has been synced; then true for ever. The one field
-    /// that is changed without the identifier locks.
+    /// False from its creation until the move into its class directory has been synced; then true for ever. The one
+    /// field that is changed without the identifier locks.
     [[nodiscard]] bool durable() const { return durable_.load(std::memory_order_acquire); }
     void setDurable(bool durable) { durable_.store(durable, std::memory_order_release); }
 

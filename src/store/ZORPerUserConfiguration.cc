@@ -62,8 +62,8 @@ std::optional<FileURL> ZORPerUserConfiguration::transientDirectory() {
     return url;
 }
 
-std::optional<FileURL>
-ZORPerUserConfiguration::containerDirectoryURLForContentClass(ContainerClass containerClass, bool transient) {
+std::optional<FileURL> ZORPerUserConfiguration::containerDirectoryURLForContentClass(ContainerClass containerClass,
+                                                                                     bool transient) {
     const RecursiveMutexLock held(lock_);
     if (!isPerUserClass(containerClass)) {
         log_.write(logLevelError, __func__, "Invalid class for a per user container directory: %llu",

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// Where the containers of one mobile user lie. Getters never fail: they make their directory on every call, log when they
-// cannot, and return the place anyway. A home that is not known makes every place below it absent.
+// Where the containers of one mobile user lie. Getters never fail: they make their directory on every call, log when
+// they cannot, and return the place anyway. A home that is not known makes every place below it absent.
 //
 // Its own recursive lock is held for a whole getter. Lock order: the global configuration's lock before this one.
 #pragma once

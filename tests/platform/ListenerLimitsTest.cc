@@ -187,6 +187,7 @@ TEST(ListenerLimits, AUserOverItsShareIsRefused) {
     EXPECT_TRUE(clients[4]->ended());
     EXPECT_EQ(world.listener().counters().connectionsDropped, 1U);
     EXPECT_LE(world.listener().counters().inputBytes, 300'000U);
+    ASSERT_TRUE(eventually([&] { return world.listener().counters().connections == 4; }));
     EXPECT_TRUE(RawClient(world.socketPath()).isServed());
     clients.clear();
     EXPECT_TRUE(world.isAtRest());

@@ -6,6 +6,7 @@
 #include <gtest/gtest.h>
 
 #include <condition_variable>
+#include <cstdlib>
 #include <ctime>
 #include <dirent.h>
 #include <fstream>
@@ -319,6 +320,54 @@ TEST(ListenerPool, ConnectionsEndWhileRepliesAreUnderWay) {
     replier.join();
     EXPECT_EQ(world.counts.invalids, static_cast<int>(world.listener().counters().connectionsAccepted));
     EXPECT_EQ(world.counts.others, 0);
+}
+
+// Goal: a reply from another thread that arms the connection just when its worker lets it go neither gets lost nor
+// brings a second worker in. Method: bursts of requests, each answered late and with more than the socket takes; the
+// peer waits for all answers of a burst, so that nothing else would wake the connection. More rounds with
+// ZORVANE_TEST_LONG.
+TEST(ListenerPool, LateRepliesMeetTheWorkerThatLetsGo) {
+    ListenerWorld world;
+    world.limits.threadsRunning = 3;
+    std::mutex mutex;
+    std::condition_variable changed;
+    std::vector<std::shared_ptr<ReplyChannel>> late;
+    bool done = false;
+    world.start([&](PeerConnection&, ServiceEvent& event) {
+        const std::lock_guard lock(mutex);
+        late.push_back(event.reply);
+        changed.notify_one();
+    });
+    const plist::Dictionary large = {{"Large", plist::Data(150'000, 2)}};
+    std::thread replier([&] {
+        std::unique_lock lock(mutex);
+        while (!done) {
+            changed.wait(lock, [&] { return done || !late.empty(); });
+            std::vector<std::shared_ptr<ReplyChannel>> taken;
+            taken.swap(late);
+            lock.unlock();
+            for (const auto& reply : taken)
+                reply->send(large);
+            lock.lock();
+        }
+    });
+    RawClient client(world.socketPath());
+    const int rounds = std::getenv("ZORVANE_TEST_LONG") ? 20'000 : 500;
+    for (int round = 0; round < rounds && !testing::Test::HasFailure(); ++round) {
+        constexpr std::uint64_t burst = 4;
+        for (std::uint64_t i = 0; i < burst; ++i)
+            ASSERT_TRUE(client.send(numbered(i), i));
+        for (std::uint64_t i = 0; i < burst; ++i)
+            ASSERT_TRUE(client.receive()) << "round " << round;
+    }
+    client.close();
+    EXPECT_TRUE(world.isAtRest());
+    {
+        const std::lock_guard lock(mutex);
+        done = true;
+        changed.notify_one();
+    }
+    replier.join();
 }
 
 std::uint64_t switchesOfListenerThreads() {

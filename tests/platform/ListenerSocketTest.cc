@@ -137,7 +137,7 @@ TEST(ListenerStatus, EveryPeerGetsOneReplyAndTheEnd) {
     {
         StatusWorld world([](Peer& peer) -> plist::Dictionary {
             return {{"Peer", plist::Dictionary{{"PID", static_cast<std::uint64_t>(peer.pid())}}},
-                    {"Padding", plist::Data(150'000, 1)}};
+                    {"Padding", plist::Data(300'000, 1)}};
         });
         std::vector<std::unique_ptr<RawClient>> unread;
         for (int i = 0; i < 50; ++i) {

@@ -71,9 +71,13 @@ pid_t execute(const std::vector<std::string>& arguments, int output) {
 
 } // namespace
 
-std::string programPath(const std::string& name) { return ZORVANE_BINARY_DIR "/bin/" + name; }
+std::string programPath(const std::string& name) {
+    return ZORVANE_BINARY_DIR "/bin/" + name;
+}
 
-double raceSeconds() { return std::getenv("ZORVANE_TEST_LONG") ? 30.0 : 2.0; }
+double raceSeconds() {
+    return std::getenv("ZORVANE_TEST_LONG") ? 30.0 : 2.0;
+}
 
 DaemonProcess::Outcome runProgram(const std::vector<std::string>& arguments) {
     int ends[2];
@@ -123,8 +127,7 @@ pid_t DaemonProcess::spawn(const std::vector<std::string>& arguments, int output
 }
 
 void DaemonProcess::start(std::vector<std::string> moreArguments) {
-    const int output =
-        ::open(path("daemon-output").c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
+    const int output = ::open(path("daemon-output").c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
     pid_ = spawn(moreArguments, output);
     ::close(output);
     for (int tries = 0; tries < 3000; ++tries) {

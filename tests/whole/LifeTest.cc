@@ -19,7 +19,7 @@ constexpr std::uint64_t dataApplication = 2;
 void expectWhole(const std::string& path) {
     for (const char* item : {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp",
                              ".com.veltra.zorvane.metadata.plist"}) {
-        struct stat status {};
+        struct stat status{};
         ASSERT_EQ(::lstat((path + "/" + item).c_str(), &status), 0) << path << "/" << item;
         const bool metadata = item[0] == '.';
         EXPECT_EQ(status.st_mode & 07777, metadata ? 0644u : 0755u) << path << "/" << item;
@@ -31,8 +31,9 @@ void expectWhole(const std::string& path) {
 
 } // namespace
 
-// Goal: nothing acknowledged is lost and nothing is there by halves, whenever the daemon is killed. Method: several clients create
-// without pause, SIGKILL after a random time, restart, every acknowledged container is looked up and every directory judged.
+// Goal: nothing acknowledged is lost and nothing is there by halves, whenever the daemon is killed. Method: several
+// clients create without pause, SIGKILL after a random time, restart, every acknowledged container is looked up and
+// every directory judged.
 TEST(Life, KilledAtAnyMomentFindsEveryAcknowledgedContainerWhole) {
     DaemonProcess daemon;
     std::mt19937 random(20261124);
@@ -46,8 +47,8 @@ TEST(Life, KilledAtAnyMomentFindsEveryAcknowledgedContainerWhole) {
             creators.emplace_back([&, thread] {
                 auto client = daemon.client();
                 for (int i = 0;; ++i) {
-                    const std::string identifier =
-                        "org.example.r" + std::to_string(round) + ".t" + std::to_string(thread) + "." + std::to_string(i);
+                    const std::string identifier = "org.example.r" + std::to_string(round) + ".t" +
+                                                   std::to_string(thread) + "." + std::to_string(i);
                     const auto made = client.createOrLookup(
                         {.containerClass = dataApplication, .user = 501, .identifier = identifier, .create = true});
                     if (!made)
@@ -88,9 +89,14 @@ TEST(Life, SecondDaemonAndSigtermAndBrokenCommandLines) {
     EXPECT_EQ(second.exitStatus, 1);
     EXPECT_NE(second.output.find("zorvaned: "), std::string::npos) << second.output;
     EXPECT_EQ(daemon.terminate(), 0);
-    for (const auto& [arguments, status] : std::vector<std::pair<std::vector<std::string>, int>>{
-             {{"--root"}, 2}, {{"--log-level", "x"}, 2}, {{"--nothing"}, 2}, {{"stray"}, 2},
-             {{"--help"}, 0}, {{"--version"}, 0},        {{"--root", "/nowhere"}, 1}}) {
+    for (const auto& [arguments, status] :
+         std::vector<std::pair<std::vector<std::string>, int>>{{{"--root"}, 2},
+                                                               {{"--log-level", "x"}, 2},
+                                                               {{"--nothing"}, 2},
+                                                               {{"stray"}, 2},
+                                                               {{"--help"}, 0},
+                                                               {{"--version"}, 0},
+                                                               {{"--root", "/nowhere"}, 1}}) {
         std::vector<std::string> all = {programPath("zorvaned")};
         all.insert(all.end(), arguments.begin(), arguments.end());
         EXPECT_EQ(runProgram(all).exitStatus, status) << arguments[0];
@@ -104,8 +110,8 @@ TEST(Life, RebootClearsTransientContainersAndOrphans) {
     std::string transientPath;
     {
         auto client = daemon.client();
-        const auto kept =
-            client.createOrLookup({.containerClass = dataApplication, .user = 501, .identifier = "kept", .create = true});
+        const auto kept = client.createOrLookup(
+            {.containerClass = dataApplication, .user = 501, .identifier = "kept", .create = true});
         const auto transient = client.createOrLookup({.containerClass = dataApplication,
                                                       .user = 501,
                                                       .identifier = "passing",

@@ -76,8 +76,8 @@ void dieOften(const DaemonProcess& daemon, unsigned seed, Clock::time_point end)
 
 } // namespace
 
-// Goal: the commands stay right and nothing leaks under many clients of which some die at any moment. Method: threads with
-// connections of their own, then the daemon's own counters and descriptors as before.
+// Goal: the commands stay right and nothing leaks under many clients of which some die at any moment. Method: threads
+// with connections of their own, then the daemon's own counters and descriptors as before.
 TEST(Load, ManyClientsAndRandomDeaths) {
     DaemonProcess daemon;
     daemon.start();
@@ -133,7 +133,7 @@ private:
     [[nodiscard]] std::string describe() const {
         std::vector<std::string> lines;
         for (const auto& entry : std::filesystem::recursive_directory_iterator(path_)) {
-            struct stat status {};
+            struct stat status{};
             ::lstat(entry.path().c_str(), &status);
             lines.push_back(entry.path().string() + " " + std::to_string(status.st_mode) + " " +
                             std::to_string(status.st_uid) + " " + std::to_string(status.st_size));
@@ -190,8 +190,9 @@ void swapUntil(Clock::time_point end, const std::string& place, const std::strin
 
 } // namespace
 
-// Goal: an owner who swaps the class directory, a container or its metadata file for links, FIFOs and other things, at any moment,
-// gets errors, and nothing outside the tree is touched; no thread hangs. Method: a race of creations and lookups, a sentinel tree.
+// Goal: an owner who swaps the class directory, a container or its metadata file for links, FIFOs and other things, at
+// any moment, gets errors, and nothing outside the tree is touched; no thread hangs. Method: a race of creations and
+// lookups, a sentinel tree.
 TEST(HostileOwner, SwapsWhatTheDaemonWorksOn) {
     if (::geteuid() != 0)
         GTEST_SKIP() << "needs root: a daemon that is not root owns everything itself";
@@ -202,11 +203,12 @@ TEST(HostileOwner, SwapsWhatTheDaemonWorksOn) {
         daemon.start();
         const Sentinel sentinel(daemon.path("outside"));
         auto first = daemon.client();
-        const auto made =
-            first.createOrLookup({.containerClass = dataApplication, .user = 501, .identifier = "victim", .create = true});
+        const auto made = first.createOrLookup(
+            {.containerClass = dataApplication, .user = 501, .identifier = "victim", .create = true});
         ASSERT_TRUE(made);
         const std::map<std::string, std::string> places = {
-            {"class directory", daemon.path(base + "/Application")}, {"its parent", daemon.path(base)},
+            {"class directory", daemon.path(base + "/Application")},
+            {"its parent", daemon.path(base)},
             {"container", made->path},
             {"metadata file", made->path + "/.com.veltra.zorvane.metadata.plist"},
             {"subdirectory", made->path + "/Library"}};

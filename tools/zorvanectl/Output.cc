@@ -69,9 +69,13 @@ std::string printable(const std::string& text) {
     return shown;
 }
 
-void Output::json(const nlohmann::json& document) const { std::printf("%s\n", dumped(document).c_str()); }
+void Output::json(const nlohmann::json& document) const {
+    std::printf("%s\n", dumped(document).c_str());
+}
 
-void Output::line(const std::string& text) const { std::printf("%s\n", text.c_str()); }
+void Output::line(const std::string& text) const {
+    std::printf("%s\n", text.c_str());
+}
 
 void Output::table(const std::vector<std::string>& header, const std::vector<std::vector<std::string>>& rows) const {
     std::vector<std::size_t> widths;
@@ -105,8 +109,8 @@ int Output::error(const zorvane::Error& error, const std::string& while_) const 
     }
     const std::string code =
         error.kind == zorvane::Error::Kind::daemon ? " (code " + std::to_string(error.code) + ")" : "";
-    std::fprintf(stderr, "zorvanectl: %s: %s%s\n  What to do: %s.\n", printable(while_).c_str(),
-                 error.message.c_str(), code.c_str(), adviceFor(error));
+    std::fprintf(stderr, "zorvanectl: %s: %s%s\n  What to do: %s.\n", printable(while_).c_str(), error.message.c_str(),
+                 code.c_str(), adviceFor(error));
     return exitCode;
 }
 

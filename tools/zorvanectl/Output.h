@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// How the tool speaks: for people in words and tables, with --json for programs; results on standard output, errors on standard
-// error.
+// How the tool speaks: for people in words and tables, with --json for programs; results on standard output, errors on
+// standard error.
 #pragma once
 
 #include "zorvane/Client.h"

@@ -3,11 +3,12 @@
 //
 //     auto client = zorvane::Client::connect({});
 //     if (!client) … client.error().message …
-//     auto container = client->createOrLookup({.containerClass = 2, .identifier = "org.example.notes", .create = true});
+//     auto container = client->createOrLookup({.containerClass = 2, .identifier = "org.example.notes", .create =
+//     true});
 //
 // A Client is one connection and is used by one thread at a time; programs that call from several threads make several.
-// Calls block until the answer is there or their time is over. After a transport error (any kind but daemon) the connection is
-// of no more use: connect again. What a caller may do is decided by the daemon's identity registry.
+// Calls block until the answer is there or their time is over. After a transport error (any kind but daemon) the
+// connection is of no more use: connect again. What a caller may do is decided by the daemon's identity registry.
 #pragma once
 
 #include "zorvane/Error.h"
@@ -37,13 +38,14 @@ struct ConnectOptions {
 /// The user id in a request that stands for the current mobile user.
 inline constexpr std::uint32_t currentMobileUser = 1;
 
-/// Number of a class by its name ("Data/Application"), the same as one types it ("data-application"), the beginning of one
-/// name alone ("data-app"), or its decimal number (1 to 13).
+/// Number of a class by its name ("Data/Application"), the same as one types it ("data-application"), the beginning of
+/// one name alone ("data-app"), or its decimal number (1 to 13).
 [[nodiscard]] std::optional<std::uint64_t> containerClassOf(std::string_view nameOrNumber);
 /// Names of the classes; index is the number, index 0 is no class.
 [[nodiscard]] std::string_view containerClassName(std::uint64_t number);
 inline constexpr std::uint64_t containerClassMax = 13;
-/// The user that owns containers of a class when nobody is named: 33 for bundles, 499 for the system's, else the current one.
+/// The user that owns containers of a class when nobody is named: 33 for bundles, 499 for the system's, else the
+/// current one.
 [[nodiscard]] std::uint32_t defaultUserOfClass(std::uint64_t number);
 
 struct Container {
@@ -97,7 +99,8 @@ private:
     std::unique_ptr<Connection> connection_;
 };
 
-/// Whom the daemon takes this program for, and why ("Peer"); for the owner of the root also how it is doing ("Counters").
+/// Whom the daemon takes this program for, and why ("Peer"); for the owner of the root also how it is doing
+/// ("Counters").
 [[nodiscard]] Result<Value> status(const ConnectOptions& options);
 
 } // namespace zorvane

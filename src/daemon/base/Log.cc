@@ -9,9 +9,13 @@ namespace {
 thread_local std::optional<std::uint32_t> provokingUserId;
 }
 
-Log::ClientScope::ClientScope(std::uint32_t userId) : outer_(provokingUserId) { provokingUserId = userId; }
+Log::ClientScope::ClientScope(std::uint32_t userId) : outer_(provokingUserId) {
+    provokingUserId = userId;
+}
 
-Log::ClientScope::~ClientScope() { provokingUserId = outer_; }
+Log::ClientScope::~ClientScope() {
+    provokingUserId = outer_;
+}
 
 bool Log::writes(int level) const {
     if (!sink_.isOpen())

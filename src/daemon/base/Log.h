@@ -1,9 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 // The daemon's log: the level gate, and printf formats that the compiler checks.
 //
-// Levels are those of the classic system log: 3 errors and refusals, 5 notable events, 7 debug traces. Levels 3 and 5 are
-// written also when no log could be opened (to standard error); level 7 only to an open log whose level is 7 or more.
-// Any thread. Lines that a client provokes are limited for each user id while a ClientScope is open on the thread.
+// Levels are those of the classic system log: 3 errors and refusals, 5 notable events, 7 debug traces. Levels 3 and 5
+// are written also when no log could be opened (to standard error); level 7 only to an open log whose level is 7 or
+// more. Any thread. Lines that a client provokes are limited for each user id while a ClientScope is open on the
+// thread.
 #pragma once
 
 #include "platform/PlatformLog.h"
@@ -60,8 +61,8 @@ private:
 std::string formatted(const char* format, ...) __attribute__((format(printf, 1, 2)));
 std::string formattedList(const char* format, std::va_list arguments) __attribute__((format(printf, 1, 0)));
 
-/// What "%s" prints for an object: at most shownBytesMax bytes; an absent one is "(null)". Copies only what it must cut.
-/// Lives as long as the full expression it is written in.
+/// What "%s" prints for an object: at most shownBytesMax bytes; an absent one is "(null)". Copies only what it must
+/// cut. Lives as long as the full expression it is written in.
 class Shown {
 public:
     Shown(const char* text) : text_(text ? text : "(null)") {}

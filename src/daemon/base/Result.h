@@ -27,7 +27,7 @@ public:
 
 /// The value of a Result; an error leaves the function with it.
 #define TRY(expression)                                                                                                \
-    __extension__({                                                                                                             \
+    __extension__({                                                                                                    \
         auto zorResult_ = (expression);                                                                                \
         if (!zorResult_)                                                                                               \
             return std::move(zorResult_).error();                                                                      \

@@ -23,6 +23,8 @@ std::optional<UUID> UUID::parse(std::string_view text) {
     return std::nullopt;
 }
 
-std::string UUID::string() const { return ipc::uuidText(bytes_); }
+std::string UUID::string() const {
+    return ipc::uuidText(bytes_);
+}
 
 } // namespace zor

@@ -17,8 +17,7 @@ void logError(const Log& log, const ZORError& error) {
         log.write(logLevelError, error.functionName(), "%d: %s (%s)", error.sourceFileLine(),
                   error.description()->c_str(), error.underlying()->text().c_str());
     else
-        log.write(logLevelError, error.functionName(), "%d: %s", error.sourceFileLine(),
-                  error.description()->c_str());
+        log.write(logLevelError, error.functionName(), "%d: %s", error.sourceFileLine(), error.description()->c_str());
 }
 
 ZORError makeError(const Log& log, Here here, ErrorCode code, const ZORError* underlying, LogFlag flag,

@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // Exceptions of this daemon, and the boundary at which an operation turns one into error 40.
 //
-// An exception means that something happened which the code has no road for: memory ran out, an invariant of a library was
-// broken. It is caught once, at the boundary of the operation; what the operation holds is released by unwinding. Only
-// std::exception and what derives from it counts; anything else passes through and is nobody's to swallow.
+// An exception means that something happened which the code has no road for: memory ran out, an invariant of a library
+// was broken. It is caught once, at the boundary of the operation; what the operation holds is released by unwinding.
+// Only std::exception and what derives from it counts; anything else passes through and is nobody's to swallow.
 #pragma once
 
 #include "daemon/base/Result.h"

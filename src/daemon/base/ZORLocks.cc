@@ -12,7 +12,9 @@ using platform::MutexLock;
 
 namespace {
 
-const char* name(LockMode mode) { return mode == LockMode::writing ? "writing" : "reading"; }
+const char* name(LockMode mode) {
+    return mode == LockMode::writing ? "writing" : "reading";
+}
 
 void sortOnce(std::vector<std::string>& identifiers) {
     std::ranges::sort(identifiers);

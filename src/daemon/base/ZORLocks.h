@@ -1,14 +1,15 @@
 // SPDX-License-Identifier: Apache-2.0
 // Locks by container identifier, and the one lock over all of them.
 //
-// Each identifier in use has a reader/writer lock, made by its first user and destroyed by its last. The all-identifiers
-// lock excludes, in write mode, every identifier lock; in read mode, every identifier writer. Operations on one known
-// container lock its UUID string; operations that may touch any identifier take the all-identifiers lock.
+// Each identifier in use has a reader/writer lock, made by its first user and destroyed by its last. The
+// all-identifiers lock excludes, in write mode, every identifier lock; in read mode, every identifier writer.
+// Operations on one known container lock its UUID string; operations that may touch any identifier take the
+// all-identifiers lock.
 //
 // One mutex guards the bookkeeping and is never held while a caller waits for an identifier's own lock. A caller counts
-// before it waits there, so a pending identifier lock already keeps an all-identifiers writer out. Several identifiers are
-// locked in ascending order of their strings; that is the lock order of the daemon, so overlapping sets cannot deadlock.
-// Nothing here fails or times out.
+// before it waits there, so a pending identifier lock already keeps an all-identifiers writer out. Several identifiers
+// are locked in ascending order of their strings; that is the lock order of the daemon, so overlapping sets cannot
+// deadlock. Nothing here fails or times out.
 //
 // Misuse (unlocking what is not locked) is said at level 3 and changes nothing.
 #pragma once
@@ -55,7 +56,7 @@ public:
 private:
     struct Record {
         std::shared_mutex lock;
-        std::uint64_t userCount = 1;      // guarded by mutex_
+        std::uint64_t userCount = 1;            // guarded by mutex_
         std::atomic<std::int32_t> lockState{0}; // 0 free, -1 write-held, n > 0 held by n readers
     };
 

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// The command handlers. Each reads its arguments, has the user resolved, calls one container operation and fills the reply.
-// Any thread of the listener; one message of a connection at a time.
+// The command handlers. Each reads its arguments, has the user resolved, calls one container operation and fills the
+// reply. Any thread of the listener; one message of a connection at a time.
 #pragma once
 
 #include "daemon/CommandTable.h"

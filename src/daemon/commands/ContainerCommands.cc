@@ -53,10 +53,9 @@ void listContainers(CommandContext& context) {
 }
 
 void deleteContainersOnDeathRow(CommandContext& context) {
-    context.client->deleteContainersOnDeathRowWithCompletion(
-        [channel = context.channel](ErrorCode code) {
-            channel->send({{std::string(keys::replyError), static_cast<std::uint64_t>(code)}});
-        });
+    context.client->deleteContainersOnDeathRowWithCompletion([channel = context.channel](ErrorCode code) {
+        channel->send({{std::string(keys::replyError), static_cast<std::uint64_t>(code)}});
+    });
 }
 
 } // namespace zor::commands

@@ -12,8 +12,7 @@ void notServedYet(CommandContext& context) {
 
 void notServedYetDeferred(CommandContext& context) {
     notServedYet(context);
-    context.channel->send(
-        {{std::string(ipc::keys::replyError), static_cast<std::uint64_t>(context.error)}});
+    context.channel->send({{std::string(ipc::keys::replyError), static_cast<std::uint64_t>(context.error)}});
 }
 
 } // namespace zor::commands

@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // Builds one container in the staging directory, complete, for one move into its class directory.
 //
-// Everything is made as the daemon's own, closed to others, and given its mode and owner in a last pass, from the deepest
-// directory up: at no moment can the future owner, or anybody whom a mode lets in, reach a directory that the daemon still
-// works in. What is made is worked on through descriptors.
+// Everything is made as the daemon's own, closed to others, and given its mode and owner in a last pass, from the
+// deepest directory up: at no moment can the future owner, or anybody whom a mode lets in, reach a directory that the
+// daemon still works in. What is made is worked on through descriptors.
 //
 // Unlike a directory getter, a container is not there by halves: a mode or an owner that cannot be set fails the build.
 //

@@ -16,8 +16,8 @@ ContainerLayout layoutOf(ContainerClass containerClass, std::uint32_t userId) {
     }
     const bool group =
         containerClass == ContainerClass::sharedAppGroup || containerClass == ContainerClass::sharedSystemGroup;
-    layout.subdirectories = group ? std::span<const char* const>(groupSubdirectories)
-                                  : std::span<const char* const>(dataSubdirectories);
+    layout.subdirectories =
+        group ? std::span<const char* const>(groupSubdirectories) : std::span<const char* const>(dataSubdirectories);
     if (isSystemClass(containerClass)) {
         layout.subdirectoryMode = 0777; // services of several users work in them
     } else {

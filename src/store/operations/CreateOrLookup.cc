@@ -5,11 +5,12 @@
 //   - while it is built: a directory in staging, which the next launch moves to death row;
 //   - after an old transient container moved to death row: that container gone, as was asked;
 //   - after the move into the class directory: the container, whole; the cache of the next process finds it.
-// What a power cut leaves is the same: the metadata file's data is on the disk before the move can be (fs/Durability.h), and the
-// move is on the disk before anybody is told of the container.
+// What a power cut leaves is the same: the metadata file's data is on the disk before the move can be
+// (fs/Durability.h), and the move is on the disk before anybody is told of the container.
 //
-// The sync after the move runs when the all-identifiers lock is released, so those of concurrent creators share the disk's
-// commit. Until it is done the record says so, and whoever finds it meanwhile waits for a sync of its own before it answers.
+// The sync after the move runs when the all-identifiers lock is released, so those of concurrent creators share the
+// disk's commit. Until it is done the record says so, and whoever finds it meanwhile waits for a sync of its own before
+// it answers.
 #include "daemon/ZORClientConnection.h"
 #include "daemon/base/UserIdentity.h"
 #include "entitlements/ZOREntitlementMapping.h"
@@ -90,11 +91,10 @@ Result<void> ZORClientConnection::discardTransient(const ZORMetadata& record, co
     const FileURL url = record.url();
     const auto moved = _moveItemAtURLToDeathRow(url, StartDeletionThread::yes);
     if (!moved)
-        return makeError(services_.log, {"createOrLookupContainerForUser", __LINE__},
-                         ErrorCode::transientRemovalFailed, &moved.error(), LogFlag::yes,
-                         "Failed to remove transient container at %s", url.c_str());
-    // With its directory gone the record would answer "no metadata" for this identifier until the daemon ends, should the
-    // container not be made again.
+        return makeError(services_.log, {"createOrLookupContainerForUser", __LINE__}, ErrorCode::transientRemovalFailed,
+                         &moved.error(), LogFlag::yes, "Failed to remove transient container at %s", url.c_str());
+    // With its directory gone the record would answer "no metadata" for this identifier until the daemon ends, should
+    // the container not be made again.
     return services_.cache.removeContainerForUser(record.uid(), record.containerClass(), &identifier, true);
 }
 

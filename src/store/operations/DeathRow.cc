@@ -2,9 +2,10 @@
 // Death row: where everything goes that is to be deleted, and the passes that delete it later.
 //
 // A move here is one rename on the caller's thread, usually under the locks of its operation; the item gets a unique
-// directory of its own, so names never collide. Passes run one after another on the death-row queue and take no lock: what is on
-// death row belongs to no container. A stop at any point leaves items, or empty unique directories, for the next pass; the
-// launch queues one. What a power cut leaves is the same: nothing is removed whose move here could still be undone.
+// directory of its own, so names never collide. Passes run one after another on the death-row queue and take no lock:
+// what is on death row belongs to no container. A stop at any point leaves items, or empty unique directories, for the
+// next pass; the launch queues one. What a power cut leaves is the same: nothing is removed whose move here could still
+// be undone.
 #include "daemon/ZORClientConnection.h"
 #include "store/StoreServices.h"
 
@@ -14,7 +15,8 @@ namespace zor {
 
 namespace {
 
-/// A pass may take the fresh directory for rubbish before the item is in it. That is rare; that often in a row it is no accident.
+/// A pass may take the fresh directory for rubbish before the item is in it. That is rare; that often in a row it is no
+/// accident.
 constexpr int uniqueDirectoriesTriedMax = 16;
 
 } // namespace
@@ -35,7 +37,8 @@ Result<void> ZORClientConnection::_moveItemAtURLToDeathRow(const FileURL& url,
                 deleteContainersOnDeathRowWithCompletion(nullptr);
             return {};
         }
-        // Only a missing source counts as success. When it is the unique directory that is missing, another one is made.
+        // Only a missing source counts as success. When it is the unique directory that is missing, another one is
+        // made.
         const bool somethingMissing = moved.error().isPosix(ENOENT);
         if (somethingMissing && fileManager.itemDoesNotExistAtURL(url))
             return {};
@@ -47,10 +50,9 @@ Result<void> ZORClientConnection::_moveItemAtURLToDeathRow(const FileURL& url,
 }
 
 void ZORClientConnection::deleteContainersOnDeathRowWithCompletion(std::function<void(ErrorCode)> completion) {
-    ZORDispatchAsyncWithTransaction(services_.transactions, services_.deathRowQueue,
-                                    [self = shared_from_this(), completion = std::move(completion)] {
-                                        self->runDeletionPass(completion);
-                                    });
+    ZORDispatchAsyncWithTransaction(
+        services_.transactions, services_.deathRowQueue,
+        [self = shared_from_this(), completion = std::move(completion)] { self->runDeletionPass(completion); });
 }
 
 void ZORClientConnection::runDeletionPass(const std::function<void(ErrorCode)>& completion) {
@@ -81,8 +83,7 @@ std::optional<ZORError> ZORClientConnection::deleteEverythingOnDeathRow() {
     const auto opened = services_.fileManager.resolver().openDirectory(deathRow);
     const int status = opened ? services_.durability.beforeRemoval(opened->get()) : -opened.error();
     if (status < 0) {
-        const ZORError cause =
-            posixError(here, -status, "sync of %s failed: %s", deathRow.c_str(), errorText(-status));
+        const ZORError cause = posixError(here, -status, "sync of %s failed: %s", deathRow.c_str(), errorText(-status));
         return makeError(services_.log, here, ErrorCode::listForDeletionFailed, &cause, LogFlag::yes,
                          "Failed to get items for deletion: %s : %s", deathRow.c_str(), cause.text().c_str());
     }
@@ -103,8 +104,7 @@ Result<void> ZORClientConnection::_removeItemOrMoveToTempAtURL(const FileURL& ur
     ZOR_LOG(services_.log, logLevelDebug, "Couldn't remove, so moving item to /tmp: %s : %s", url.c_str(),
             removed.error().text().c_str());
     const FileURL temporary = services_.configuration.temporaryDirectory();
-    const auto moved =
-        services_.fileManager.moveItemAtURL(url, temporary.appendingDirectory(url.lastPathComponent()));
+    const auto moved = services_.fileManager.moveItemAtURL(url, temporary.appendingDirectory(url.lastPathComponent()));
     if (moved)
         return {};
     return makeError(services_.log, ZOR_HERE, ErrorCode::moveToTemporaryFailed, &moved.error(), LogFlag::yes,

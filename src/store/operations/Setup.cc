@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // Bringing the store into a consistent state before any client is served: once a boot, and at every launch.
 //
-// Runs on the thread that starts the daemon, alone, and takes no identifier lock. Neither setup fails: what goes wrong is
-// logged and the next step runs. Every step may be repeated, so a stop anywhere is mended by the next launch: the boot's
-// work is marked as done only when all of it ran.
+// Runs on the thread that starts the daemon, alone, and takes no identifier lock. Neither setup fails: what goes wrong
+// is logged and the next step runs. Every step may be repeated, so a stop anywhere is mended by the next launch: the
+// boot's work is marked as done only when all of it ran.
 #include "daemon/ZORClientConnection.h"
 #include "daemon/base/UserIdentity.h"
 #include "entitlements/ZORWhitelist.h"
@@ -34,7 +34,9 @@ bool isSharedClass(ContainerClass containerClass) {
     return isBundleClass(containerClass) || isSystemClass(containerClass);
 }
 
-bool isUserClass(ContainerClass containerClass) { return isPerUserClass(containerClass); }
+bool isUserClass(ContainerClass containerClass) {
+    return isPerUserClass(containerClass);
+}
 
 } // namespace
 
@@ -52,9 +54,8 @@ void ZORClientConnection::rebootContainerManagerSetup() {
         if (!user || !user->existsUserBaseDirectory())
             continue;
         discard(user->transientDirectory(), "per-user transient");
-        forEachClass(isUserClass, [&](ContainerClass containerClass) {
-            _cleanupOrphanedDataForUser(userId, containerClass);
-        });
+        forEachClass(isUserClass,
+                     [&](ContainerClass containerClass) { _cleanupOrphanedDataForUser(userId, containerClass); });
     }
     forEachClass(isSharedClass, [&](ContainerClass containerClass) {
         _cleanupOrphanedDataForUser(isBundleClass(containerClass) ? bundleOwnerUserId : systemOwnerUserId,
@@ -64,8 +65,8 @@ void ZORClientConnection::rebootContainerManagerSetup() {
 
 bool ZORClientConnection::isOrphan(const FileURL& entry, ContainerClass containerClass) {
     const std::string_view name = entry.lastPathComponent();
-    // An identifier of the table whose container goes by another name is a name all the same: what lies there is not ours to
-    // judge by a table that may have changed.
+    // An identifier of the table whose container goes by another name is a name all the same: what lies there is not
+    // ours to judge by a table that may have changed.
     const bool acceptable = UUID::parse(name) || services_.whitelist.containerIdIsWellknown(name, containerClass) ||
                             services_.whitelist.directoryNameIsWellknown(name, containerClass);
     if (!acceptable)
