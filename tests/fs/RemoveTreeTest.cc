@@ -21,15 +21,22 @@ namespace {
 using platform::FileDescriptor;
 using support::TemporaryDirectory;
 
-bool setFlags(int parent, const std::string& path, int flags) {
+constexpr int protectingFlags = FS_IMMUTABLE_FL | FS_APPEND_FL;
+
+/// Sets exactly these of the protecting flags; the file system has others of its own.
+bool setFlags(int parent, const std::string& path, int wanted) {
     const FileDescriptor fd(::openat(parent, path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+    int flags = 0;
+    if (::ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) != 0)
+        return false;
+    flags = (flags & ~protectingFlags) | wanted;
     return ::ioctl(fd.get(), FS_IOC_SETFLAGS, &flags) == 0;
 }
 
 int flagsOf(int parent, const std::string& path) {
     const FileDescriptor fd(::openat(parent, path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
     int flags = 0;
-    return ::ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) == 0 ? flags & (FS_IMMUTABLE_FL | FS_APPEND_FL) : -1;
+    return ::ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) == 0 ? flags & protectingFlags : -1;
 }
 
 /// The paths of failed items, and of directories made mutable with a "+".
