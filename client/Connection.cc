@@ -6,6 +6,7 @@
 #include "ipc/Names.h"
 #include "plist/Binary.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <fcntl.h>
@@ -41,6 +42,7 @@ sockaddr_un addressOf(const std::string& path, const std::string& name, int dire
     return address;
 }
 
+constexpr std::size_t replyBytesFirst = std::size_t{64} * 1024;
 constexpr std::size_t replyBytesMax = std::size_t{1}
                                       << 30; // a list of every container of a large device takes a few MiB
 
@@ -101,8 +103,11 @@ Result<std::uint64_t> Client::Connection::send(const plist::Dictionary& request)
     for (std::size_t sent = 0; sent < frame.size();) {
         if (auto ready = waitFor(POLLOUT); !ready)
             return std::unexpected(ready.error());
-        const ssize_t count = ::send(socket_.get(), frame.data() + sent, frame.size() - sent, MSG_NOSIGNAL);
-        if (count < 0 && errno == EINTR)
+        // With a time limit it is the poll that waits: a blocking send could wait for the rest of the frame without
+        // one.
+        const int flags = deadline_ ? MSG_NOSIGNAL | MSG_DONTWAIT : MSG_NOSIGNAL;
+        const ssize_t count = ::send(socket_.get(), frame.data() + sent, frame.size() - sent, flags);
+        if (count < 0 && (errno == EINTR || errno == EAGAIN))
             continue;
         if (count < 0)
             return fail(Error::Kind::refused, "zorvaned ended the connection: this program may not send the command");
@@ -133,9 +138,14 @@ Result<Client::Connection::Reply> Client::Connection::receive() {
     const ipc::FrameHeader header = ipc::decodeFrameHeader(headerBytes);
     if (!header.isValidReply() || header.payloadBytes > replyBytesMax)
         return fail(Error::Kind::protocol, "what came back is no reply");
-    plist::Data payload(header.payloadBytes);
-    if (auto read = readAll(payload.data(), payload.size()); !read)
-        return std::unexpected(read.error());
+    // Memory is taken as bytes arrive, not as the header promises.
+    plist::Data payload;
+    while (payload.size() < header.payloadBytes) {
+        const std::size_t have = payload.size();
+        payload.resize(std::min<std::size_t>(header.payloadBytes, std::max(2 * have, replyBytesFirst)));
+        if (auto read = readAll(payload.data() + have, payload.size() - have); !read)
+            return std::unexpected(read.error());
+    }
     auto value = plist::readBinary(payload);
     plist::Dictionary* content = value ? value->asMutableDictionary() : nullptr;
     if (!content)

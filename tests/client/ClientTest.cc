@@ -1,0 +1,323 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "zorvane/Client.h"
+#include "ipc/ContainerClasses.h"
+#include "ipc/Frame.h"
+#include "ipc/Keys.h"
+#include "ipc/Uuid.h"
+#include "platform/FileDescriptor.h"
+#include "plist/Binary.h"
+
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <cstdlib>
+#include <cstring>
+#include <fcntl.h>
+#include <functional>
+#include <future>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <thread>
+#include <unistd.h>
+
+namespace zorvane {
+namespace {
+
+using zor::platform::FileDescriptor;
+namespace ipc = zor::ipc;
+namespace plist = zor::plist;
+using Kind = Error::Kind;
+
+plist::Data frame(std::uint32_t length, std::uint32_t flags, std::uint64_t id, const plist::Data& payload) {
+    plist::Data bytes(ipc::frameHeaderBytes);
+    ipc::encodeFrameHeader({.payloadBytes = length, .flags = flags, .id = id},
+                           std::span(bytes).first<ipc::frameHeaderBytes>());
+    bytes.insert(bytes.end(), payload.begin(), payload.end());
+    return bytes;
+}
+
+plist::Data reply(const plist::Value& root, std::uint64_t id) {
+    const plist::Data payload = *plist::writeBinary(root);
+    return frame(static_cast<std::uint32_t>(payload.size()), ipc::frameIsReply, id, payload);
+}
+
+/// A root with a daemon that reads one request and then does what the test says.
+class ScriptedDaemon {
+public:
+    using Script = std::function<void(int socket, std::uint64_t id)>;
+
+    /// `depth` more characters in the root's path.
+    explicit ScriptedDaemon(std::size_t depth = 1) : base_("/tmp/zorvane-client-XXXXXX") {
+        ::mkdtemp(base_.data());
+        std::string path = base_;
+        for (const std::string& name : {std::string(depth, 'r'), std::string("run"), std::string("zorvane")}) {
+            path += "/" + name;
+            ::mkdir(path.c_str(), 0755);
+            made_.push_back(path);
+        }
+        directory_.reset(::open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    }
+    ~ScriptedDaemon() {
+        if (thread_.joinable())
+            thread_.join();
+        ::unlinkat(directory_.get(), "com.veltra.zorvaned", 0);
+        for (std::size_t i = made_.size(); i-- > 0;)
+            ::rmdir(made_[i].c_str());
+        ::rmdir(base_.c_str());
+    }
+
+    void serve(Script script) {
+        listening_.reset(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+        sockaddr_un address = {};
+        address.sun_family = AF_UNIX;
+        std::snprintf(address.sun_path, sizeof address.sun_path, "/proc/self/fd/%d/com.veltra.zorvaned",
+                      directory_.get());
+        ASSERT_EQ(::bind(listening_.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+        ASSERT_EQ(::listen(listening_.get(), 1), 0);
+        thread_ = std::thread([this, script = std::move(script)] {
+            const FileDescriptor socket(::accept4(listening_.get(), nullptr, nullptr, SOCK_CLOEXEC));
+            std::array<std::uint8_t, ipc::frameHeaderBytes> header;
+            if (::recv(socket.get(), header.data(), header.size(), MSG_WAITALL) != ipc::frameHeaderBytes)
+                return;
+            const ipc::FrameHeader request = ipc::decodeFrameHeader(header);
+            EXPECT_TRUE(request.isValidRequest());
+            EXPECT_TRUE(request.expectsReply());
+            plist::Data payload(request.payloadBytes);
+            EXPECT_EQ(::recv(socket.get(), payload.data(), payload.size(), MSG_WAITALL),
+                      static_cast<ssize_t>(payload.size()));
+            script(socket.get(), request.id);
+        });
+    }
+    void leaveSocketBehind() { listening_.reset(); }
+
+    [[nodiscard]] ConnectOptions options(std::uint32_t timeoutMilliseconds = 10'000) const {
+        return {.root = made_[0], .timeoutMilliseconds = timeoutMilliseconds};
+    }
+
+private:
+    std::string base_;
+    std::vector<std::string> made_;
+    FileDescriptor directory_;
+    FileDescriptor listening_;
+    std::thread thread_;
+};
+
+void put(int socket, const plist::Data& bytes) {
+    ::send(socket, bytes.data(), bytes.size(), MSG_NOSIGNAL);
+}
+
+plist::Dictionary found() {
+    return {{"ReplyError", std::uint64_t{1}},
+            {"ReplyUUID", plist::Data(16, 0xAB)},
+            {"ReplyExisted", true},
+            {"ReplyPath", "/somewhere"},
+            {"ReplyIdentifier", "a.b"}};
+}
+
+plist::Dictionary without(plist::Dictionary dictionary, std::string_view key) {
+    dictionary.erase(key);
+    return dictionary;
+}
+
+plist::Dictionary with(plist::Dictionary dictionary, std::string_view key, plist::Value value) {
+    dictionary.set(key, std::move(value));
+    return dictionary;
+}
+
+// Goal: whatever a daemon sends, or does not send, a call ends with the right kind of error and no crash. Method: a
+// table of scripts; two of them are right, with another request's reply before.
+TEST(Client, EveryAnswerHasItsKind) {
+    struct Row {
+        const char* what;
+        ScriptedDaemon::Script script;
+        std::optional<Kind> kind;
+        std::uint64_t code = 0;
+    };
+    const auto answer = [](const plist::Value& root) {
+        return [root](int socket, std::uint64_t id) { put(socket, reply(root, id)); };
+    };
+    const auto bytes = [](plist::Data data) {
+        return [data = std::move(data)](int socket, std::uint64_t) { put(socket, data); };
+    };
+    const std::vector<Row> rows = {
+        {"right", answer(found()), std::nullopt},
+        {"another's reply first",
+         [](int socket, std::uint64_t id) {
+             put(socket, reply(plist::Dictionary{{"ReplyError", std::uint64_t{5}}}, id + 7));
+             put(socket, reply(found(), id));
+         },
+         std::nullopt},
+        {"in single bytes",
+         [](int socket, std::uint64_t id) {
+             for (const std::uint8_t byte : reply(found(), id))
+                 put(socket, {byte});
+         },
+         std::nullopt},
+        {"closed without an answer", [](int, std::uint64_t) {}, Kind::refused},
+        {"half a header", bytes({1, 0, 0}), Kind::refused},
+        {"half a payload", bytes(frame(100, 2, 1, plist::Data(50))), Kind::refused},
+        {"a gigabyte promised, nothing sent", bytes(frame(1'000'000'000, 2, 1, {})), Kind::refused},
+        {"more than a client takes", bytes(frame(0xFFFF'FFFF, 2, 1, {})), Kind::protocol},
+        {"no length", bytes(frame(0, 2, 1, {})), Kind::protocol},
+        {"no reply bit", bytes(frame(4, 0, 1, plist::Data(4))), Kind::protocol},
+        {"unknown flag", bytes(frame(4, 6, 1, plist::Data(4))), Kind::protocol},
+        {"no property list", bytes(frame(4, 2, 1, plist::Data(4))), Kind::protocol},
+        {"an array", answer(plist::Array{}), Kind::protocol},
+        {"no code", answer(without(found(), "ReplyError")), Kind::protocol},
+        {"code of another type", answer(with(found(), "ReplyError", "1")), Kind::protocol},
+        {"no path", answer(without(found(), "ReplyPath")), Kind::protocol},
+        {"short UUID", answer(with(found(), "ReplyUUID", plist::Data(15))), Kind::protocol},
+        {"not found", answer(plist::Dictionary{{"ReplyError", std::uint64_t{21}}}), Kind::daemon, 21},
+        {"a code from the future", answer(plist::Dictionary{{"ReplyError", ~std::uint64_t{0}}}), Kind::daemon,
+         ~std::uint64_t{0}},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.what);
+        ScriptedDaemon daemon;
+        daemon.serve(row.script);
+        auto client = Client::connect(daemon.options());
+        ASSERT_TRUE(client);
+        const auto container = client->createOrLookup({.containerClass = 2, .identifier = "a.b"});
+        if (!row.kind) {
+            ASSERT_TRUE(container) << container.error().message;
+            EXPECT_EQ(container->path, "/somewhere");
+            EXPECT_EQ(container->identifier, "a.b");
+            EXPECT_TRUE(container->existed);
+            EXPECT_EQ(uuidText(container->uuid), "ABABABAB-ABAB-ABAB-ABAB-ABABABABABAB");
+            continue;
+        }
+        ASSERT_FALSE(container);
+        EXPECT_EQ(container.error().kind, *row.kind) << container.error().message;
+        EXPECT_EQ(container.error().code, row.code);
+        EXPECT_FALSE(container.error().message.empty());
+    }
+}
+
+// Goal: a list is whole or an error. Method: pairs of arrays that do not fit each other.
+TEST(Client, ListsAreJudged) {
+    const plist::Value uuid = plist::Data(16, 1);
+    struct Row {
+        plist::Dictionary message;
+        std::optional<std::size_t> count;
+    };
+    const plist::Dictionary empty = {{"ReplyError", std::uint64_t{1}}};
+    const auto lists = [&](plist::Array identifiers, plist::Array uuids) {
+        return with(with(empty, "ReplyIdsArray", std::move(identifiers)), "ReplyUUIDsArray", std::move(uuids));
+    };
+    for (const Row& row : std::initializer_list<Row>{
+             {lists({}, {}), 0},
+             {lists({"a", "b"}, {uuid, uuid}), 2},
+             {lists({"a", "b"}, {uuid}), std::nullopt},
+             {lists({"a"}, {uuid, uuid}), std::nullopt},
+             {lists({std::uint64_t{1}}, {uuid}), std::nullopt},
+             {lists({"a"}, {"b"}), std::nullopt},
+             {empty, std::nullopt},
+         }) {
+        ScriptedDaemon daemon;
+        daemon.serve([&](int socket, std::uint64_t id) { put(socket, reply(row.message, id)); });
+        auto client = Client::connect(daemon.options());
+        ASSERT_TRUE(client);
+        const auto list = client->list(2, 501, false);
+        EXPECT_EQ(list.has_value(), row.count.has_value());
+        if (list && row.count) {
+            EXPECT_EQ(list->size(), *row.count);
+        }
+        if (!list) {
+            EXPECT_EQ(list.error().kind, Kind::protocol);
+        }
+    }
+}
+
+// Goal: a call takes no longer than its time, also when something keeps coming. Method: a daemon that is silent, and
+// one that sends a byte now and then.
+TEST(Client, TimeRunsOut) {
+    for (const bool drips : {false, true}) {
+        std::promise<void> over;
+        ScriptedDaemon daemon;
+        daemon.serve([&, done = over.get_future().share()](int socket, std::uint64_t id) {
+            for (const std::uint8_t byte : reply(found(), id)) {
+                if (done.wait_for(std::chrono::milliseconds(20)) == std::future_status::ready)
+                    return;
+                if (drips)
+                    put(socket, {byte});
+            }
+            done.wait();
+        });
+        auto client = Client::connect(daemon.options(150));
+        ASSERT_TRUE(client);
+        const auto begin = std::chrono::steady_clock::now();
+        const auto done = client->emptyDeathRow();
+        const auto taken = std::chrono::steady_clock::now() - begin;
+        over.set_value();
+        ASSERT_FALSE(done);
+        EXPECT_EQ(done.error().kind, Kind::timedOut);
+        EXPECT_GE(taken, std::chrono::milliseconds(150));
+        EXPECT_LT(taken, std::chrono::seconds(5));
+    }
+}
+
+// Goal: a daemon that is not there is said so, with the path that was tried. Method: no directory, no socket, a socket
+// that nobody listens on any more.
+TEST(Client, NobodyThere) {
+    const auto expectUnreachable = [](const ConnectOptions& options) {
+        const auto client = Client::connect(options);
+        ASSERT_FALSE(client);
+        EXPECT_EQ(client.error().kind, Kind::unreachable);
+        EXPECT_NE(client.error().message.find(options.root + "/run/zorvane/com.veltra.zorvaned"), std::string::npos)
+            << client.error().message;
+        const auto answer = status(options);
+        ASSERT_FALSE(answer);
+        EXPECT_EQ(answer.error().kind, Kind::unreachable);
+    };
+    expectUnreachable({.root = "/nonexistent"});
+    const ScriptedDaemon nothing;
+    expectUnreachable(nothing.options());
+    ScriptedDaemon gone;
+    gone.serve([](int, std::uint64_t) {});
+    ASSERT_TRUE(Client::connect(gone.options()));
+    gone.leaveSocketBehind();
+    expectUnreachable(gone.options());
+}
+
+TEST(Client, RootsOfAnyLength) {
+    for (const std::size_t depth : {48U, 49U, 50U, 51U, 52U, 53U, 54U, 55U, 250U}) {
+        ScriptedDaemon daemon(depth);
+        daemon.serve([](int socket, std::uint64_t id) { put(socket, reply(found(), id)); });
+        auto client = Client::connect(daemon.options());
+        ASSERT_TRUE(client) << depth << " " << client.error().message;
+        EXPECT_TRUE(client->createOrLookup({.containerClass = 2, .identifier = "a.b"})) << depth;
+    }
+}
+
+// Goal: every code that a daemon sends has words of its own. Method: all codes of the protocol, against an unknown one.
+TEST(Client, EveryCodeHasItsWords) {
+    const std::string unknown = errorText(0).meaning;
+    for (const std::uint64_t code : {1,  4,  5,  6,  7,  8,  9,  10, 11, 12, 14, 15, 17, 18, 21, 22, 23, 24, 27, 28, 29,
+                                     33, 34, 35, 36, 38, 40, 41, 43, 44, 45, 46, 47, 48, 49, 55, 56, 59, 60, 61, 62}) {
+        EXPECT_NE(errorText(code).meaning, unknown) << code;
+        EXPECT_NE(std::string(errorText(code).advice), "") << code;
+    }
+    EXPECT_EQ(errorText(~std::uint64_t{0}).meaning, unknown);
+}
+
+// Goal: people's words for classes mean the right number and nothing vague means any. Method: full names, numbers, the
+// short forms, and words that fit none or several.
+TEST(Client, WordsForClasses) {
+    for (std::uint64_t number = 1; number <= containerClassMax; ++number) {
+        EXPECT_EQ(containerClassOf(ipc::containerClassNames[number]), number);
+        EXPECT_EQ(containerClassOf(std::to_string(number)), number);
+        EXPECT_EQ(containerClassName(number), ipc::containerClassNames[number]);
+    }
+    EXPECT_EQ(containerClassOf("data-app"), 2U);
+    EXPECT_EQ(containerClassOf("bundle-app"), 1U);
+    for (const char* wrong :
+         {"", "0", "14", "-1", "2x", "99999999999999999999", "data", "shared", "Data/", "Undefined"})
+        EXPECT_FALSE(containerClassOf(wrong)) << wrong;
+    EXPECT_EQ(defaultUserOfClass(1), 33U);
+    EXPECT_EQ(defaultUserOfClass(2), currentMobileUser);
+    EXPECT_EQ(defaultUserOfClass(12), 499U);
+}
+
+} // namespace
+} // namespace zorvane
