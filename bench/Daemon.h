@@ -49,6 +49,7 @@ public:
     [[nodiscard]] const std::string& socketDirectory() const { return socketDirectory_; }
     /// Just before the process was made.
     [[nodiscard]] Clock::time_point startedAt() const { return startedAt_; }
+    [[nodiscard]] double processorSeconds() const { return process_->processorSeconds(); }
     [[nodiscard]] double residentKiB() const;
     [[nodiscard]] int descriptorCount() const;
 

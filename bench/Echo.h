@@ -22,6 +22,7 @@ public:
     Echo(const std::string& directory, std::size_t requestBytes, Frame reply, const Options& options);
 
     [[nodiscard]] Client connect() const;
+    [[nodiscard]] double processorSeconds() const { return process_->processorSeconds(); }
 
 private:
     const std::string directory_;

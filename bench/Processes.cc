@@ -6,6 +6,7 @@
 #include <cerrno>
 #include <csignal>
 #include <cstring>
+#include <ctime>
 #include <sys/prctl.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -32,6 +33,14 @@ ChildProcess::~ChildProcess() {
     ::kill(pid_, SIGKILL);
     while (::waitpid(pid_, nullptr, 0) < 0 && errno == EINTR) {
     }
+}
+
+double ChildProcess::processorSeconds() const {
+    clockid_t clock = 0;
+    timespec time{};
+    if (const int error = ::clock_getcpuclockid(pid_, &clock); error != 0 || ::clock_gettime(clock, &time) != 0)
+        throw Failure("the processor time of a process cannot be read");
+    return static_cast<double>(time.tv_sec) + static_cast<double>(time.tv_nsec) * 1e-9;
 }
 
 std::optional<int> ChildProcess::take(int options) {

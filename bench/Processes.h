@@ -29,6 +29,8 @@ public:
     ChildProcess& operator=(const ChildProcess&) = delete;
 
     [[nodiscard]] pid_t pid() const { return pid_; }
+    /// Processor time that all of its threads took so far.
+    [[nodiscard]] double processorSeconds() const;
     /// Its exit status once it ended by itself within the limit (128 and the number when by a signal); else nothing.
     std::optional<int> waitFor(int milliseconds);
     /// The same, as long as it takes.

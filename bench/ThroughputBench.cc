@@ -92,11 +92,57 @@ std::vector<Client> connections(const Server& server, int count) {
     return clients;
 }
 
+/// Blocks of one server: its rates, and the processor time that each answer took it.
+struct Blocks {
+    std::vector<double> perSecond{};
+    std::vector<double> shares{};
+    std::vector<double> microsecondsEach{};
+
+    template <typename Server>
+    void add(Crowd& crowd, const Server& server, double seconds, unsigned threads) {
+        const double before = server.processorSeconds();
+        perSecond.push_back(crowd.run(seconds, threads));
+        microsecondsEach.push_back((server.processorSeconds() - before) / (perSecond.back() * seconds) * 1e6);
+        shares.push_back(crowd.slowestByMean());
+    }
+};
+
+std::vector<Figure> figuresOf(int count, const Blocks& measured, const Blocks& floor) {
+    const Pairs pairs{.measured = measured.perSecond, .floor = floor.perSecond};
+    const double each = median(measured.microsecondsEach);
+    const double floorEach = median(floor.microsecondsEach);
+    const double share = median(measured.shares);
+    const double worst = std::ranges::min(measured.shares);
+    return {{.name = text("throughput.%d", count),
+             .what = text("lookups per second, %d connections", count),
+             .measured = text("%.0f /s", pairs.measuredMedian()),
+             .floor = text("%.0f /s", pairs.floorMedian()),
+             .value = pairs.ratio(),
+             .unit = "x",
+             .sense = Sense::atLeast,
+             .goal = 0.5,
+             .remark = text("processor time of each %.1f us, of the floor %.1f us", each, floorEach),
+             .numbers = {{"perSecond", pairs.measuredMedian()},
+                         {"floorPerSecond", pairs.floorMedian()},
+                         {"processorMicroseconds", each},
+                         {"floorProcessorMicroseconds", floorEach}}},
+            {.name = text("throughput.%d.slowest", count),
+             .what = text("slowest of %d connections, by the mean one", count),
+             .measured = text("%.2f", share),
+             .floor = "",
+             .value = share,
+             .unit = "x",
+             .sense = Sense::atLeast,
+             .goal = 0.5,
+             .remark = text("median of %zu blocks; in the worst one %.2f", measured.shares.size(), worst),
+             .numbers = {{"worstBlock", worst}}}};
+}
+
 } // namespace
 
 std::vector<Figure> measureThroughput(const Settings& settings) {
-    const int blocks = settings.rounds(9, 5);
-    const double seconds = settings.quick ? 0.25 : 0.5;
+    const int blocks = settings.rounds(41, 11);
+    const double seconds = 0.1;
     const unsigned threads = std::max(1U, std::thread::hardware_concurrency());
     const Place place(*settings.scratch, "throughput", {.bytes = std::uint64_t{256} << 20, .inodes = 16384});
     prepareRoot(settings, place.path());
@@ -114,38 +160,16 @@ std::vector<Figure> measureThroughput(const Settings& settings) {
     for (const int count : {16, 64}) {
         Crowd crowd(connections(daemon, count), request, reply);
         Crowd floorCrowd(connections(echo, count), request, reply);
-        Pairs pairs;
-        std::vector<double> shares;
-        for (int block = -1; block < blocks; ++block) {
-            const double measured = crowd.run(seconds, threads);
-            const double floor = floorCrowd.run(seconds, threads);
-            if (block < 0)
-                continue;
-            pairs.measured.push_back(measured);
-            pairs.floor.push_back(floor);
-            shares.push_back(crowd.slowestByMean());
+        Blocks measured;
+        Blocks floor;
+        (void)crowd.run(seconds, threads);
+        (void)floorCrowd.run(seconds, threads);
+        for (int block = 0; block < blocks; ++block) {
+            measured.add(crowd, daemon, seconds, threads);
+            floor.add(floorCrowd, echo, seconds, threads);
         }
-        figures.push_back(
-            {.name = text("throughput.%d", count),
-             .what = text("lookups per second, %d connections", count),
-             .measured = text("%.0f /s", pairs.measuredMedian()),
-             .floor = text("%.0f /s", pairs.floorMedian()),
-             .value = pairs.ratio(),
-             .unit = "x",
-             .sense = Sense::atLeast,
-             .goal = 0.5,
-             .numbers = {{"perSecond", pairs.measuredMedian()}, {"floorPerSecond", pairs.floorMedian()}}});
-        figures.push_back({.name = text("throughput.%d.slowest", count),
-                           .what = text("slowest of %d connections, by the mean one", count),
-                           .measured = text("%.2f", median(shares)),
-                           .floor = "",
-                           .value = median(shares),
-                           .unit = "x",
-                           .sense = Sense::atLeast,
-                           .goal = 0.5,
-                           .remark = text("median of %d blocks of %.2f s; in the worst one %.2f", blocks, seconds,
-                                          std::ranges::min(shares)),
-                           .numbers = {{"worstBlock", std::ranges::min(shares)}}});
+        for (Figure& figure : figuresOf(count, measured, floor))
+            figures.push_back(std::move(figure));
     }
     return figures;
 }
