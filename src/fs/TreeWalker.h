@@ -6,7 +6,7 @@
 // visited as what it is now. A directory is visited before and after its content. A mount point, or a subvolume, is
 // visited before and after but not entered, and nothing of what lies on it is asked.
 //
-// Any depth and any width: at most DirectoryStack::openMax + 2 descriptors, no recursion, and memory that grows with
+// Any depth and any width: fewer than DirectoryStack::openMax + 8 descriptors, no recursion, and memory that grows with
 // the length of the current path alone. A directory whose descriptor had to be closed is found again by ".." and must
 // be the same inode as before; else by its names from the root, each of them checked; else it counts as vanished, with
 // what was not yet visited in it.
