@@ -126,6 +126,8 @@ void LinuxServiceListener::stop() {
 }
 
 ListenerCounters LinuxServiceListener::counters() const {
+    if (!core_)
+        return {};
     const ListenerCharges::Totals totals = core_->charges.totals();
     const ListenerPool::Counters pool = core_->pool.counters();
     const auto count = [this](ListenerIncident incident) { return core_->incidents.count(incident); };

@@ -58,7 +58,7 @@ public:
     /// nowhere.
     void stop() override;
 
-    /// Any thread, between resume and the end of the object.
+    /// All zero before resume. Any thread, but not during resume.
     [[nodiscard]] ListenerCounters counters() const;
 
 private:
