@@ -130,7 +130,7 @@ function(zor_test area)
     target_compile_definitions(zor_${area}_tests PRIVATE ZORVANE_SOURCE_DIR="${CMAKE_SOURCE_DIR}"
         ZORVANE_BINARY_DIR="${CMAKE_BINARY_DIR}")
     target_link_libraries(zor_${area}_tests PRIVATE zor_options ${ARG_LINK} GTest::gtest GTest::gtest_main)
-    gtest_discover_tests(zor_${area}_tests DISCOVERY_MODE PRE_TEST PROPERTIES TIMEOUT 300)
+    gtest_discover_tests(zor_${area}_tests DISCOVERY_MODE PRE_TEST NO_PRETTY_VALUES PROPERTIES TIMEOUT 300)
 endfunction()
 
 # zor_fuzz(name LINK libs...): fuzz/<name>.cc as a libFuzzer program. Its seeds are the files in fuzz/seeds/<name>/.
