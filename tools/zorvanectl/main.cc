@@ -11,12 +11,12 @@ using namespace zorvanectl;
 
 constexpr const char* footer = R"(
 Examples:
-  zorvanectl create org.example.notes --class Data/Application
+  zorvanectl create org.example.notes --class data-app
   zorvanectl lookup org.example.notes --class 2 --user 501 --json
   zorvanectl list --class Bundle/Application
   zorvanectl status
 
-Classes, by name or number:
+Classes, by number, name, or the beginning of one name in lower case (data-app):
    1 Bundle/Application    2 Data/Application      3 Bundle/KolvexPlugin
    4 Data/KolvexPlugin     5 Bundle/VPNPlugin      6 Data/VPNPlugin
    7 Shared/AppGroup       8 Bundle/Framework      9 Data/IpsiService
