@@ -31,6 +31,9 @@ inline constexpr std::string_view deathrow = "Dead";
 inline constexpr std::string_view replace = "Replace";
 inline constexpr std::string_view bundle = "Bundle";
 
+/// In every data container: what is there for the while that its process runs.
+inline constexpr const char* containerTemporary = "tmp";
+
 /// In the library directory: what each identifier is entitled to.
 inline constexpr const char* entitlementFile = "zor_entitlements.plist";
 /// What an entitlement file that cannot be read is renamed to; its presence stops every pass that deletes on its word.

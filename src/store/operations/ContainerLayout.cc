@@ -1,10 +1,13 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/operations/ContainerLayout.h"
 
+#include "store/Names.h"
+
 namespace zor {
 
 namespace {
-constexpr const char* dataSubdirectories[] = {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp"};
+constexpr const char* dataSubdirectories[] = {"Documents", "Library", "Library/Caches", "Library/Preferences",
+                                              names::containerTemporary};
 constexpr const char* groupSubdirectories[] = {"Library", "Library/Caches"};
 } // namespace
 
