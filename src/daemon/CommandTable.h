@@ -6,6 +6,7 @@
 #include "daemon/base/UserIdentity.h"
 #include "ipc/Keys.h"
 #include "platform/ServiceListener.h"
+#include "store/StoreServices.h"
 
 #include <array>
 #include <memory>
@@ -21,6 +22,7 @@ struct CommandContext {
     const std::shared_ptr<ZORClientConnection>& client;
     const std::shared_ptr<platform::ReplyChannel>& channel;
     UserIdentity& users;
+    StoreServices& services;
     const Log& log;
     /// Success when the handler is entered; a handler that fails stores its code here.
     ErrorCode& error;

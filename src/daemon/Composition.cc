@@ -16,7 +16,8 @@ Composition::Composition(platform::Platform platform, fs::Durability::Probe prob
 }
 
 Composition::Late::Late(Composition& composition)
-    : entitlements(composition.log_, composition.fileManager_, composition.configuration_),
+    : entitlements(composition.log_, composition.fileManager_, composition.configuration_, services),
+      groups(composition.log_, services),
       whitelist(ZORWhitelist::forSystem(composition.log_, composition.fileManager_)),
       services{.log = composition.log_,
                .boundary = composition.boundary_,
@@ -26,17 +27,20 @@ Composition::Late::Late(Composition& composition)
                .configuration = composition.configuration_,
                .cache = composition.cache_,
                .entitlements = entitlements,
+               .groups = groups,
                .whitelist = whitelist,
                .internalBuild = composition.platform_.internalBuild,
                .sandbox = composition.platform_.sandbox,
                .deathRowQueue = composition.platform_.deathRowQueue,
-               .transactions = composition.platform_.transactions},
-      sharedClient(std::make_shared<ZORClientConnection>(
-          services, ZORClientConnection::Client{.bundleIdentifier = "com.veltra.zorvaned.internal",
-                                                .userId = 0,
-                                                .allowOtherIdLookup = true,
-                                                .entitledWipeIdentifiers = std::nullopt})),
-      dispatcher(composition.log_, composition.users_, services) {}
+               .transactions = composition.platform_.transactions,
+               .sharedClientConnection = nullptr},
+      dispatcher(composition.log_, composition.users_, services) {
+    services.sharedClientConnection = std::make_shared<ZORClientConnection>(
+        services, ZORClientConnection::Client{.bundleIdentifier = "com.veltra.zorvaned.internal",
+                                              .userId = 0,
+                                              .allowOtherIdLookup = true,
+                                              .entitledWipeIdentifiers = std::nullopt});
+}
 
 Composition::Late& Composition::late() {
     if (!late_)
@@ -53,11 +57,15 @@ Dispatcher& Composition::dispatcher() {
 }
 
 const std::shared_ptr<ZORClientConnection>& Composition::sharedClientConnection() {
-    return late().sharedClient;
+    return late().services.sharedClientConnection;
 }
 
 ZOREntitlementMapping& Composition::entitlements() {
     return late().entitlements;
+}
+
+ZORGroupManager& Composition::groups() {
+    return late().groups;
 }
 
 const ZORWhitelist& Composition::whitelist() {

@@ -13,6 +13,7 @@
 #include "daemon/base/ZORException.h"
 #include "daemon/base/ZORLocks.h"
 #include "entitlements/ZOREntitlementMapping.h"
+#include "entitlements/ZORGroupManager.h"
 #include "entitlements/ZORWhitelist.h"
 #include "fs/Durability.h"
 #include "fs/ZORFileManager.h"
@@ -46,6 +47,7 @@ public:
     /// The daemon's own client.
     [[nodiscard]] const std::shared_ptr<ZORClientConnection>& sharedClientConnection();
     [[nodiscard]] ZOREntitlementMapping& entitlements();
+    [[nodiscard]] ZORGroupManager& groups();
     [[nodiscard]] ZORContainerCache& cache() { return cache_; }
     [[nodiscard]] ZORLocks& locks() { return locks_; }
     [[nodiscard]] const ZORWhitelist& whitelist();
@@ -68,9 +70,9 @@ private:
     struct Late {
         explicit Late(Composition& composition);
         ZOREntitlementMapping entitlements;
+        ZORGroupManager groups;
         ZORWhitelist whitelist;
         StoreServices services;
-        std::shared_ptr<ZORClientConnection> sharedClient;
         Dispatcher dispatcher;
     };
     std::optional<Late> late_;

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/Dispatcher.h"
 
+#include "entitlements/ZOREntitlementMapping.h"
 #include "platform/EntitlementKeys.h"
 
 namespace zor {
@@ -66,6 +67,7 @@ bool Dispatcher::serve(platform::PeerConnection& connection, platform::ServiceEv
                            .client = client,
                            .channel = event.reply,
                            .users = users_,
+                           .services = services_,
                            .log = log_,
                            .error = error};
     row.handler(context);
@@ -113,7 +115,18 @@ Dispatcher::checkEntitlementsAndInitClientObject(const ZORCommandTableRow& row, 
                                        .entitledWipeIdentifiers = std::move(wipeIdentifiers)};
     if (identifier)
         client.bundleIdentifier = *identifier;
+    registerEntitlements(identifier, *entitlements);
     return std::make_shared<ZORClientConnection>(services_, std::move(client));
+}
+
+void Dispatcher::registerEntitlements(const std::string* identifier, const plist::Dictionary& entitlements) const {
+    if (identifier && !services_.entitlements.callerRegistrationIsDue(*identifier, entitlements))
+        return;
+    static const plist::Dictionary byCaller{{std::string(entitlementMapKeys::registeredByCaller), true}};
+    const ErrorCode code = services_.entitlements.processEntitlements(&entitlements, identifier, &byCaller);
+    if (code != ErrorCode::success)
+        log_.write(logLevelError, handlerName, "Error processing entitlements for %s : %llu", ZOR_SHOWN(identifier),
+                   static_cast<unsigned long long>(code));
 }
 
 void Dispatcher::sayMissingEntitlement(const ZORCommandTableRow& row, const platform::Identity& identity) const {

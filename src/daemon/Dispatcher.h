@@ -39,6 +39,8 @@ private:
     /// The client of an admitted message; nullptr (said, where it is to be said) when the message is refused.
     std::shared_ptr<ZORClientConnection> checkEntitlementsAndInitClientObject(const ZORCommandTableRow& row,
                                                                               const platform::Identity& identity);
+    /// Keeps what is stored for the peer's identifier up to date, unless somebody registered it on the peer's behalf.
+    void registerEntitlements(const std::string* identifier, const plist::Dictionary& entitlements) const;
     void sayMissingEntitlement(const ZORCommandTableRow& row, const platform::Identity& identity) const;
 
     const Log& log_;

@@ -16,6 +16,10 @@
 #include "daemon/base/ZORLocks.h"
 #include "store/ZORMetadata.h"
 
+#include <atomic>
+#include <cstddef>
+#include <cstdint>
+#include <expected>
 #include <functional>
 #include <memory>
 #include <optional>
@@ -26,7 +30,7 @@ namespace zor {
 
 struct StoreServices;
 
-enum class UseLocking { no, yes };
+enum class UseLocking : std::int32_t { no, yes };
 enum class StartDeletionThread { no, yes };
 
 /// A container as an operation found or made it. What a reply needs of the record was read while the operation still
@@ -47,13 +51,19 @@ public:
         bool allowOtherIdLookup = false;
         std::optional<std::vector<std::string>> entitledWipeIdentifiers;
     };
-    ZORClientConnection(StoreServices& services, Client client) : services_(services), client_(std::move(client)) {}
+    ZORClientConnection(StoreServices& services, Client client)
+        : services_(services), client_(std::move(client)), allowOtherIdLookup_(client_.allowOtherIdLookup) {}
     ZORClientConnection(const ZORClientConnection&) = delete;
     ZORClientConnection& operator=(const ZORClientConnection&) = delete;
 
     [[nodiscard]] const std::optional<std::string>& clientBundleIdentifier() const { return client_.bundleIdentifier; }
     [[nodiscard]] std::uint32_t clientUserId() const { return client_.userId; }
-    [[nodiscard]] bool allowOtherIdLookup() const { return client_.allowOtherIdLookup; }
+    // What the client may look up beyond its own; handlers widen or narrow it. Any thread: the daemon's own client is
+    // used by several.
+    [[nodiscard]] bool allowOtherIdLookup() const { return allowOtherIdLookup_; }
+    void setAllowOtherIdLookup(bool allow) { allowOtherIdLookup_ = allow; }
+    [[nodiscard]] bool allowGroupIdLookup() const { return allowGroupIdLookup_; }
+    void setAllowGroupIdLookup(bool allow) { allowGroupIdLookup_ = allow; }
 
     // Creation and lookup (CreateOrLookup.cc).
     struct CreateOrLookupOptions {
@@ -62,10 +72,35 @@ public:
         UseLocking useLocking = UseLocking::yes;
     };
     /// The container of (user, identifier, class), created if asked. With locking it runs under the all-identifiers
-    /// lock held for writing. `identifier` nullptr: error 11.
+    /// lock held for writing. Without, the caller holds that lock, and calls makeDurable on what it got when it has
+    /// released it and before it tells anybody. `identifier` nullptr: error 11.
     Result<FoundContainer> createOrLookupContainerForUser(std::uint32_t userId, const std::string* identifier,
                                                           ContainerClass containerClass,
                                                           const CreateOrLookupOptions& options);
+
+    /// Returns at once for a container whose place is on the disk already. Error 8.
+    Result<void> makeDurable(const FoundContainer& container);
+
+    // Deletion (Deletion.cc).
+    /// Parallel lists; element i of each describes one container. An element that a client gave with another type is
+    /// absent.
+    struct DeletionBatch {
+        std::vector<std::uint32_t> users;
+        std::vector<std::optional<UUID>> uuids;
+        std::vector<std::optional<std::string>> identifiers;
+        /// A class number, or how an element that is no number reads.
+        std::vector<std::expected<std::uint64_t, std::string>> classes;
+
+        static DeletionBatch of(std::uint32_t userId, const UUID& uuid, const std::string& identifier,
+                                ContainerClass containerClass);
+    };
+    /// Takes the containers out of the store; their files go with the next deletion pass. What is not there is skipped,
+    /// what is malformed is logged and skipped. With locking it runs under the all-identifiers lock held for writing;
+    /// without, the caller holds it. Errors 11 (lists that do not agree), 46, 40.
+    Result<void> stageForDeleteContainersWithUsers(const DeletionBatch& batch, UseLocking useLocking);
+    /// Stages the one container of an identifier. Errors as the lookup's and the staging's.
+    Result<void> deleteContainerForUser(std::uint32_t userId, const std::string* identifier,
+                                        ContainerClass containerClass, bool transient);
 
     // Listing (Listing.cc).
     struct ListedContainer {
@@ -102,7 +137,12 @@ private:
                                   bool transient);
     Result<void> checkRequest(std::uint32_t userId, const std::string* identifier, ContainerClass containerClass);
     ZORError cleanUpStaging(const FileURL& staging, ZORError error);
-    Result<void> makeDurable(const FoundContainer& container);
+
+    /// One element; `changed` gets the directories to be synced.
+    Result<void> stageForDelete(const DeletionBatch& batch, std::size_t index, std::vector<FileURL>& changed);
+    /// False, logged, when the container stays where it is.
+    bool takeAwayForDelete(const FileURL& container, std::vector<FileURL>& changed);
+    Result<void> makeDeletionsDurable(std::vector<FileURL> changed);
 
     void runDeletionPass(const std::function<void(ErrorCode)>& completion);
     std::optional<ZORError> deleteEverythingOnDeathRow();
@@ -112,7 +152,9 @@ private:
     void makeDirectoriesDurable();
 
     StoreServices& services_;
-    Client client_;
+    const Client client_;
+    std::atomic<bool> allowOtherIdLookup_;
+    std::atomic<bool> allowGroupIdLookup_{false};
 };
 
 } // namespace zor

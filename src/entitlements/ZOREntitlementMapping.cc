@@ -6,6 +6,8 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <ranges>
+#include <utility>
 
 namespace zor {
 
@@ -16,12 +18,13 @@ namespace {
 /// Far above any device's map (a thousand identifiers take about a megabyte), far below what reading could not bear.
 constexpr std::size_t mappingFileBytesMax = std::size_t{64} << 20;
 constexpr std::string_view systemGroupPrefix = "systemgroup.";
+constexpr const char* setFunction = "_setEntitlementDictionaryValues";
 
 } // namespace
 
 ZOREntitlementMapping::ZOREntitlementMapping(const Log& log, ZORFileManager& fileManager,
-                                             ZORGlobalConfiguration& configuration)
-    : log_(log), fileManager_(fileManager), configuration_(configuration),
+                                             ZORGlobalConfiguration& configuration, StoreServices& services)
+    : log_(log), fileManager_(fileManager), configuration_(configuration), services_(services),
       entitlementMappingFileUrl_(configuration.libraryDirectory().appendingFile(names::entitlementFile)),
       entitlementMappingDict_(_readEntitlementMappingFromDisk()) {}
 
@@ -67,7 +70,7 @@ std::optional<FileURL> ZOREntitlementMapping::lostFile() {
 Result<void> ZOREntitlementMapping::_writeEntitlementMappingToDisk() {
     configuration_.libraryDirectory(); // makes it again should it have gone
     const auto written = writeToURL(entitlementMappingDict_, entitlementMappingFileUrl_,
-                                    writeAtomically | writeWithoutProtection, fileManager_);
+                                    writeAtomically | writeWithoutProtection, mappingFileBytesMax, fileManager_);
     if (!written)
         return makeError(log_, ZOR_HERE, ErrorCode::entitlementFileNotWritten, &written.error(), LogFlag::yes,
                          "Failed to write entitlement mapping file at %s", entitlementMappingFileUrl_.c_str());
@@ -76,12 +79,18 @@ Result<void> ZOREntitlementMapping::_writeEntitlementMappingToDisk() {
 
 Result<void> ZOREntitlementMapping::_setEntitlementDictionaryValues(const std::vector<plist::Dictionary>& values,
                                                                     const std::vector<std::string>& identifiers) {
+    const MutexLock held(entitlementQueue_);
+    return _onQueue_setEntitlementDictionaryValues(values, identifiers);
+}
+
+Result<void>
+ZOREntitlementMapping::_onQueue_setEntitlementDictionaryValues(const std::vector<plist::Dictionary>& values,
+                                                               const std::vector<std::string>& identifiers) {
     if (values.size() != identifiers.size())
-        return makeError(log_, ZOR_HERE, ErrorCode::entitlementCountsDiffer, nullptr, LogFlag::yes,
+        return makeError(log_, {setFunction, __LINE__}, ErrorCode::entitlementCountsDiffer, nullptr, LogFlag::yes,
                          "Can't act on an invalid input: values count: %ld, IDs count: %ld",
                          static_cast<long>(values.size()), static_cast<long>(identifiers.size()));
-    const MutexLock held(entitlementQueue_);
-    bool changed = false;
+    std::vector<std::pair<std::string, std::optional<plist::Value>>> previous;
     for (std::size_t i = 0; i < values.size(); ++i) {
         const bool hasValue = !values[i].empty();
         const plist::Value* current = entitlementMappingDict_.find(identifiers[i]);
@@ -89,26 +98,34 @@ Result<void> ZOREntitlementMapping::_setEntitlementDictionaryValues(const std::v
         const bool unchanged = hasValue ? currentDictionary && *currentDictionary == values[i] : !current;
         if (unchanged)
             continue;
+        previous.emplace_back(identifiers[i], current ? std::optional(*current) : std::nullopt);
         if (hasValue)
             entitlementMappingDict_.set(identifiers[i], values[i]);
         else
             entitlementMappingDict_.erase(identifiers[i]);
         if (log_.writes(logLevelDebug)) {
             const plist::Value shown(values[i]);
-            log_.write(logLevelDebug, __func__, "Staging Entitlement Mapping for ID: %s : %s",
+            log_.write(logLevelDebug, setFunction, "Staging Entitlement Mapping for ID: %s : %s",
                        ZOR_SHOWN(identifiers[i]), plist::describe(hasValue ? &shown : nullptr).c_str());
         }
-        changed = true;
     }
-    if (!changed && !unsaved_)
+    if (previous.empty() && !unsaved_)
         return {};
     auto written = _writeEntitlementMappingToDisk();
-    unsaved_ = !written;
-    if (!written)
-        log_.write(logLevelError, __func__, "Error writing entitlement mappings to disk after set : %s",
-                   written.error().text().c_str());
+    if (!written && written.error().underlying()->isPosix(EFBIG))
+        // No later save could succeed either: this change alone is refused.
+        for (auto& [key, value] : previous | std::views::reverse)
+            if (value)
+                entitlementMappingDict_.set(key, std::move(*value));
+            else
+                entitlementMappingDict_.erase(key);
     else
-        ZOR_LOG(log_, logLevelDebug, "Wrote entitlement mappings to disk after set");
+        unsaved_ = !written;
+    if (!written)
+        log_.write(logLevelError, setFunction, "Error writing entitlement mappings to disk after set : %s",
+                   written.error().text().c_str());
+    else if (log_.writes(logLevelDebug))
+        log_.write(logLevelDebug, setFunction, "Wrote entitlement mappings to disk after set");
     return written;
 }
 
@@ -206,6 +223,11 @@ ZOREntitlementMapping::Identifiers
 ZOREntitlementMapping::systemGroupIdentifiersForIdentifier(std::string_view identifier) {
     const MutexLock held(entitlementQueue_);
     return _onQueue_systemGroupIdentifiersForIdentifier(identifier);
+}
+
+plist::Dictionary ZOREntitlementMapping::entitlementMappingDict() {
+    const MutexLock held(entitlementQueue_);
+    return entitlementMappingDict_;
 }
 
 std::size_t ZOREntitlementMapping::entryCount() {

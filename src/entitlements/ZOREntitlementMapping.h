@@ -5,6 +5,9 @@
 // public operations enter synchronously; it is a mutex here, since nothing ever runs on it by itself. Operations whose
 // names begin with _onQueue_ run inside it and never enter it again.
 //
+// Storing and asking is in ZOREntitlementMapping.cc; what a change of entitlements makes of containers is in
+// ZOREntitlementProcessing.cc.
+//
 // A stop during a save leaves the old file or the new one. A file that is there but cannot be read is moved aside,
 // never written over: as long as it lies there, nothing may be deleted because the map does not mention it (lostFile).
 #pragma once
@@ -12,6 +15,7 @@
 #include "daemon/base/Result.h"
 #include "platform/Mutex.h"
 #include "plist/Value.h"
+#include "store/StoreServices.h"
 #include "store/ZORGlobalConfiguration.h"
 
 #include <optional>
@@ -40,8 +44,9 @@ class ZOREntitlementMapping {
 public:
     using Identifiers = std::optional<std::vector<std::string>>;
 
-    /// Loads the map.
-    ZOREntitlementMapping(const Log& log, ZORFileManager& fileManager, ZORGlobalConfiguration& configuration);
+    /// Loads the map. `services` may still be in the making; it is used from the first change on.
+    ZOREntitlementMapping(const Log& log, ZORFileManager& fileManager, ZORGlobalConfiguration& configuration,
+                          StoreServices& services);
     ZOREntitlementMapping(const ZOREntitlementMapping&) = delete;
     ZOREntitlementMapping& operator=(const ZOREntitlementMapping&) = delete;
 
@@ -54,6 +59,25 @@ public:
     /// Without those that do not begin with "systemgroup.".
     [[nodiscard]] Identifiers systemGroupIdentifiersForIdentifier(std::string_view identifier)
         ZOR_EXCLUDES(entitlementQueue_);
+
+    /// Registers, changes or (`entitlements` nullptr) removes the entitlements of one identifier, under the
+    /// all-identifiers lock held for writing; what changes nothing takes neither that lock nor the disk. System and
+    /// group containers that nothing refers to afterwards are staged for deletion. `options` may be nullptr.
+    /// Codes: success; 18 without an identifier; 11 for an identifier that is a key of the map's own, or a parent that
+    /// is no string; 59 when the file cannot be written; 40.
+    ErrorCode processEntitlements(const plist::Dictionary* entitlements, const std::string* identifier,
+                                  const plist::Dictionary* options) ZOR_EXCLUDES(entitlementQueue_);
+    /// Whether a peer with this identifier has to be registered as it comes: it has never been, or it was registered so
+    /// with something else. One short visit to the queue: asked for every message.
+    [[nodiscard]] bool callerRegistrationIsDue(const std::string& identifier, const plist::Dictionary& entitlements)
+        ZOR_EXCLUDES(entitlementQueue_);
+    /// Removes what is stored for an identifier and for the children recorded for it. The caller holds the
+    /// all-identifiers lock, or knows why it need not.
+    void removeEntitlementDictionariesForIdentifierAndItsChildren(const std::string& identifier)
+        ZOR_EXCLUDES(entitlementQueue_);
+
+    /// A copy of the whole map.
+    [[nodiscard]] plist::Dictionary entitlementMappingDict() ZOR_EXCLUDES(entitlementQueue_);
 
     /// Stores a value under each key (an empty dictionary removes the key) and saves once, when anything changed. Error
     /// 60 when the counts differ, 59 when the save fails: the map in memory then keeps the change, and the next call
@@ -87,9 +111,42 @@ private:
     [[nodiscard]] Identifiers _onQueue_systemGroupIdentifiersForIdentifier(std::string_view identifier) const
         ZOR_REQUIRES(entitlementQueue_);
 
+    /// What a call of processEntitlements will store, in this order.
+    struct StagedChange {
+        std::vector<plist::Dictionary> values;
+        std::vector<std::string> keys;
+        /// The identifier's own entitlements are among it.
+        bool entitlementsChange = false;
+
+        [[nodiscard]] bool empty() const { return keys.empty(); }
+        void add(std::string_view key, plist::Dictionary value);
+    };
+    enum class SayStaging { no, yes };
+
+    [[nodiscard]] StagedChange _onQueue_stage(const plist::Dictionary* entitlements, const std::string& identifier,
+                                              const plist::Dictionary* options, SayStaging say) const
+        ZOR_REQUIRES(entitlementQueue_);
+    void _onQueue_stageChildBundles(StagedChange& staged, const std::string& identifier,
+                                    const plist::Dictionary* options, SayStaging say) const
+        ZOR_REQUIRES(entitlementQueue_);
+    void _onQueue_stageFlag(StagedChange& staged, std::string_view key, const std::string& identifier,
+                            const plist::Dictionary* options) const ZOR_REQUIRES(entitlementQueue_);
+    ErrorCode _onQueue_processEntitlements(const plist::Dictionary* entitlements, const std::string* identifier,
+                                           const plist::Dictionary* options) ZOR_REQUIRES(entitlementQueue_);
+    Result<void> _onQueue_process(const plist::Dictionary* entitlements, const std::string& identifier,
+                                  const plist::Dictionary* options) ZOR_REQUIRES(entitlementQueue_);
+    void _onQueue_releaseSystemContainer(const plist::Dictionary* entitlements, const std::string& identifier)
+        ZOR_REQUIRES(entitlementQueue_);
+    void _onQueue_releaseGroups(const plist::Dictionary* entitlements, const std::string& identifier)
+        ZOR_REQUIRES(entitlementQueue_);
+    Result<void> _onQueue_setEntitlementDictionaryValues(const std::vector<plist::Dictionary>& values,
+                                                         const std::vector<std::string>& identifiers)
+        ZOR_REQUIRES(entitlementQueue_);
+
     const Log& log_;
     ZORFileManager& fileManager_;
     ZORGlobalConfiguration& configuration_;
+    StoreServices& services_;
     const FileURL entitlementMappingFileUrl_;
     platform::Mutex entitlementQueue_;
     plist::Dictionary entitlementMappingDict_ ZOR_GUARDED_BY(entitlementQueue_);

@@ -17,9 +17,10 @@ inline constexpr std::uint32_t writeAtomically = 0x1;
 inline constexpr std::uint32_t writeWithoutProtection = 0x10000000;
 
 /// Serialises as a binary property list and writes it, 0644 and the daemon's own; POSIX error with the previous file
-/// untouched. Both options are what every caller wants; others are not offered.
+/// untouched. Both options are what every caller wants; others are not offered. EFBIG, before anything is written, for
+/// more than `bytesMax`: what a reader would refuse must not replace what it accepts.
 Result<void> writeToURL(const plist::Dictionary& dictionary, const FileURL& url, std::uint32_t options,
-                        ZORFileManager& fileManager);
+                        std::size_t bytesMax, ZORFileManager& fileManager);
 
 /// A dictionary from a file that only the daemon can have written, in either property-list form. POSIX error: ENOENT
 /// when there is none, EINVAL when it is no dictionary.

@@ -45,7 +45,7 @@ Result<void> ZORFileManager::removeItemAtURL(const std::optional<FileURL>& url) 
         return posixError(ZOR_HERE, parent.error(), "prunetree of %s failed: %s", url->c_str(),
                           errorText(parent.error()));
     int firstError = 0;
-    constexpr const char* function = "removeItemAtURL";
+    static constexpr const char* function = "removeItemAtURL";
     fs::RemoveCallbacks callbacks;
     callbacks.directoryMadeMutable = [&](const std::string& path) {
         log_.write(logLevelNotice, function, "Unset UF_IMMUTABLE on %s", ZOR_SHOWN(below(*url, path)));
@@ -227,7 +227,7 @@ void ZORFileManager::standardizeEntry(int parent, const char* name, const std::s
 
 Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid) {
     const bool rootIsMetadata = url.path().find(names::metadataFile) != std::string::npos;
-    const Result<void> walked = _traverseDirectory(url, [&](const WalkEntry& entry) -> Result<void> {
+    Result<void> walked = _traverseDirectory(url, [&](const WalkEntry& entry) -> Result<void> {
         const std::string path = below(url, entry.path());
         if (entry.kind != WalkEntryKind::directoryEnd && !entry.onOtherFileSystem &&
             path.find(names::metadataFile) == std::string::npos)

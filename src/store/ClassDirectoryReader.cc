@@ -75,7 +75,7 @@ void readAll(SharedReading& reading, std::map<std::size_t, ZORError>& errors) {
                 }
             });
         } catch (const std::system_error&) {
-            // No thread to be had: this one reads alone.
+            other = std::thread(); // none to be had: this one reads alone
         }
     }
     std::exception_ptr ownException;

@@ -13,9 +13,14 @@
 #include "store/ZORContainerCache.h"
 #include "store/ZORGlobalConfiguration.h"
 
+#include <functional>
+#include <memory>
+
 namespace zor {
 
+class ZORClientConnection;
 class ZOREntitlementMapping;
+class ZORGroupManager;
 class ZORWhitelist;
 
 struct StoreServices {
@@ -27,11 +32,14 @@ struct StoreServices {
     ZORGlobalConfiguration& configuration;
     ZORContainerCache& cache;
     ZOREntitlementMapping& entitlements;
+    ZORGroupManager& groups;
     const ZORWhitelist& whitelist;
     const platform::InternalBuildQuery& internalBuild;
     platform::SandboxUserState& sandbox;
     platform::WorkQueue& deathRowQueue;
     platform::ServiceTransactions& transactions;
+    /// The daemon's own client. It is made over these services, so it comes last; nothing runs before it is there.
+    std::shared_ptr<ZORClientConnection> sharedClientConnection;
 };
 
 /// Runs `job` later on a queue; the daemon counts as busy until it has run.

@@ -81,7 +81,7 @@ plist::Dictionary ZORMetadata::fileContent() const {
 Result<void> ZORMetadata::writeMetadataToDiskWithError(const Log& log, ZORFileManager& fileManager) const {
     const FileURL container = url();
     const auto written = writeToURL(fileContent(), container.appendingFile(names::metadataFile),
-                                    writeAtomically | writeWithoutProtection, fileManager);
+                                    writeAtomically | writeWithoutProtection, fs::metadataFileBytesMax, fileManager);
     if (!written)
         return makeError(log, ZOR_HERE, ErrorCode::propertyListNotWritten, &written.error(), LogFlag::yes,
                          "Failed to write metadata dictionary to URL %s", container.c_str());

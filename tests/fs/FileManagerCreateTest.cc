@@ -213,15 +213,15 @@ TEST_F(FileManager, DictionariesAreReplacedWhole) {
     const plist::Dictionary next{{"a", "new"}, {"b", plist::Array{1, 2}}};
     const FileURL file = FileURL::file(path("f.plist"));
     const mode_t mask = ::umask(077);
-    ASSERT_TRUE(writeToURL(old, file, options, manager()));
+    ASSERT_TRUE(writeToURL(old, file, options, bytesMax, manager()));
     ::umask(mask);
     EXPECT_TRUE(item("f.plist").starts_with("100644"));
     EXPECT_TRUE(content("f.plist").starts_with("bplist00"));
-    EXPECT_FALSE(writeToURL(next, file, writeAtomically, manager()));
+    EXPECT_FALSE(writeToURL(next, file, writeAtomically, bytesMax, manager()));
     std::size_t failures = 0;
     for (std::size_t point = 1;; ++point) {
         disk.arm({.point = point});
-        const auto written = writeToURL(next, file, options, manager());
+        const auto written = writeToURL(next, file, options, bytesMax, manager());
         const bool met = disk.met();
         disk.disarm();
         const auto found = readDictionaryAtURL(file, bytesMax, manager());
@@ -236,7 +236,7 @@ TEST_F(FileManager, DictionariesAreReplacedWhole) {
             ++failures;
             EXPECT_TRUE(written.error().isPosix(EIO));
         }
-        ASSERT_TRUE(writeToURL(old, file, options, manager()));
+        ASSERT_TRUE(writeToURL(old, file, options, bytesMax, manager()));
         EXPECT_EQ(names(""), (std::vector<std::string>{"f.plist", "run"})) << point;
     }
     EXPECT_GE(failures, 4U);
@@ -247,7 +247,7 @@ TEST_F(FileManager, DictionariesAreReplacedWhole) {
 TEST_F(FileManager, HostileDictionaryFiles) {
     const plist::Dictionary good{{"a", "b"}};
     const FileURL file = FileURL::file(path("good"));
-    ASSERT_TRUE(writeToURL(good, file, writeAtomically | writeWithoutProtection, manager()));
+    ASSERT_TRUE(writeToURL(good, file, writeAtomically | writeWithoutProtection, bytesMax, manager()));
     const std::string bytes = content("good");
     makeFile("groupWritable", bytes, 0664);
     makeFile("othersWritable", bytes, 0646);

@@ -119,6 +119,8 @@ TEST(Setup, AnInternalBuildShowsWhatItDeletes) {
 TEST(Setup, BootAndLaunch) {
     World world;
     const std::string identifier = "com.example";
+    const plist::Dictionary groups{{std::string(entitlementKeys::applicationGroups), plist::Array{identifier}}};
+    ASSERT_EQ(world.services().entitlements().processEntitlements(&groups, &identifier, nullptr), ErrorCode::success);
     const auto make = [&](std::uint32_t userId, ContainerClass containerClass, bool transient) {
         return world.daemonsClient()
             .createOrLookupContainerForUser(userId, &identifier, containerClass,

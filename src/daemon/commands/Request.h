@@ -22,15 +22,27 @@ namespace zor::commands {
     return own ? &*own : nullptr;
 }
 
-/// The user that the request acts on. Without one the context has its error.
-[[nodiscard]] inline std::optional<std::uint32_t> userOf(CommandContext& context, std::string_view key,
-                                                         ContainerClass containerClass) {
-    const auto requested = static_cast<std::uint32_t>(context.request.unsignedInteger(key).value_or(0));
-    const auto resolved = context.users.validateUserId(requested, containerClass, context.client->clientUserId());
+/// The user that stands for `requested` (its low 32 bits count). Without one the context has its error.
+[[nodiscard]] inline std::optional<std::uint32_t> validatedUser(CommandContext& context, std::uint64_t requested,
+                                                                ContainerClass containerClass) {
+    const auto resolved = context.users.validateUserId(static_cast<std::uint32_t>(requested), containerClass,
+                                                       context.client->clientUserId());
     if (resolved)
         return *resolved;
     context.error = resolved.error().replyCode();
     return std::nullopt;
+}
+
+/// The user that the request acts on. Without one the context has its error.
+[[nodiscard]] inline std::optional<std::uint32_t> userOf(CommandContext& context, std::string_view key,
+                                                         ContainerClass containerClass) {
+    return validatedUser(context, context.request.unsignedInteger(key).value_or(0), containerClass);
+}
+
+/// For operations that give nothing but success or an error.
+inline void storeError(CommandContext& context, const Result<void>& result) {
+    if (!result)
+        context.error = result.error().replyCode();
 }
 
 } // namespace zor::commands

@@ -43,7 +43,7 @@ Result<FoundContainer> ZORClientConnection::createOrLookupContainerForUser(std::
                 lock.emplace(services_.locks, LockMode::writing);
             found = TRY(createOrLookup(userId, *identifier, containerClass, options));
         }
-        if (!found.record->durable())
+        if (options.useLocking == UseLocking::yes)
             TRY(makeDurable(found));
         return found;
     });
@@ -151,6 +151,8 @@ ZORError ZORClientConnection::cleanUpStaging(const FileURL& staging, ZORError er
 }
 
 Result<void> ZORClientConnection::makeDurable(const FoundContainer& container) {
+    if (container.record->durable())
+        return {};
     const platform::BlockingScope blocking;
     const FileURL live = FileURL::directory(container.path);
     const auto directory = services_.fileManager.resolver().openDirectory(live.deletingLastPathComponent());

@@ -1,11 +1,12 @@
 // SPDX-License-Identifier: Apache-2.0
 // Bringing the store into a consistent state before any client is served: once a boot, and at every launch.
 //
-// Runs on the thread that starts the daemon, alone, and takes no identifier lock. Neither setup fails: what goes wrong
-// is logged and the next step runs. Every step may be repeated, so a stop anywhere is mended by the next launch: the
-// boot's work is marked as done only when all of it ran.
+// Runs on the thread that starts the daemon, alone; only the group references take identifier locks, for their
+// deletions. Neither setup fails: what goes wrong is logged and the next step runs. Every step may be repeated, so a
+// stop anywhere is mended by the next launch: the boot's work is marked as done only when all of it ran.
 #include "daemon/ZORClientConnection.h"
 #include "daemon/base/UserIdentity.h"
+#include "entitlements/ZORGroupManager.h"
 #include "entitlements/ZORWhitelist.h"
 #include "store/Names.h"
 #include "store/StoreServices.h"
@@ -49,6 +50,8 @@ void ZORClientConnection::rebootContainerManagerSetup() {
     };
     discard(services_.configuration.transientDirectory(), "shared transient");
     discard(services_.configuration.transientBundleDirectory(), "shared transient bundle");
+    services_.groups.reconcileGroupContainersOfType(GroupType::system);
+    services_.groups.reconcileGroupContainersOfType(GroupType::application);
     for (std::uint32_t userId = firstMobileUserId; userId <= lastMobileUserId; ++userId) {
         ZORPerUserConfiguration* user = services_.configuration.getPerUserConfigurationForUserId(userId);
         if (!user || !user->existsUserBaseDirectory())

@@ -1,0 +1,229 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "entitlements/ZORGroupManager.h"
+
+#include "daemon/ZORClientConnection.h"
+#include "daemon/base/UserIdentity.h"
+#include "entitlements/ZOREntitlementMapping.h"
+#include "store/StoreServices.h"
+
+#include <algorithm>
+
+namespace zor {
+
+namespace {
+
+struct GroupKind {
+    std::string_view key;
+    std::string_view fallbackKey; // empty: none
+    ContainerClass containerClass;
+};
+
+const GroupKind& kindOf(GroupType type) {
+    static constexpr GroupKind application{entitlementKeys::applicationGroups, {}, ContainerClass::sharedAppGroup};
+    static constexpr GroupKind system{entitlementKeys::systemGroups, entitlementKeys::systemGroupContainers,
+                                      ContainerClass::sharedSystemGroup};
+    return type == GroupType::application ? application : system;
+}
+
+/// The groups that an entry of the map lists for this kind, whatever they are; nullptr for none.
+const plist::Value* groupsIn(const plist::Value* entry, const GroupKind& kind) {
+    const plist::Dictionary* entitlements = entry ? entry->asDictionary() : nullptr;
+    if (!entitlements)
+        return nullptr;
+    const plist::Value* value = entitlements->find(kind.key);
+    const bool nothing = !value || (value->asArray() && value->asArray()->empty());
+    return nothing && !kind.fallbackKey.empty() ? entitlements->find(kind.fallbackKey) : value;
+}
+
+} // namespace
+
+void ZORGroupManager::forEachUser(GroupType type, const std::function<void(std::uint32_t)>& function) {
+    if (type == GroupType::system) {
+        function(systemOwnerUserId);
+        return;
+    }
+    for (std::uint32_t userId = firstMobileUserId; userId <= lastMobileUserId; ++userId) {
+        ZORPerUserConfiguration* user = services_.configuration.getPerUserConfigurationForUserId(userId);
+        if (user && user->existsUserBaseDirectory())
+            function(userId);
+    }
+}
+
+ZORGroupManager::References ZORGroupManager::referencesIn(const plist::Dictionary& map, GroupType type,
+                                                          LogFlag logFlag) const {
+    constexpr const char* function = "_copyReferenceCountSetOfType";
+    const GroupKind& kind = kindOf(type);
+    References references;
+    for (const auto& [identifier, entry] : map) {
+        const plist::Value* groups = groupsIn(&entry, kind);
+        if (!groups)
+            continue;
+        const plist::Array* array = groups->asArray();
+        if (logFlag == LogFlag::yes && !array)
+            log_.write(logLevelError, function, "identifier: %s has non-array type of group container IDs: %s",
+                       ZOR_SHOWN(identifier), plist::describe(groups).c_str());
+        else if (logFlag == LogFlag::yes && log_.writes(logLevelDebug))
+            log_.write(logLevelDebug, function, "Entitlements for identifier %s references container IDs: %s",
+                       ZOR_SHOWN(identifier), plist::describe(groups).c_str());
+        for (const plist::Value& group : array ? *array : plist::Array())
+            if (const std::string* name = group.asString())
+                references[*name].push_back(identifier);
+    }
+    return references;
+}
+
+std::optional<ZORGroupManager::References>
+ZORGroupManager::_copyReferenceCountSetOfType(GroupType type, const plist::Dictionary& map) const {
+    if (const auto lost = services_.entitlements.lostFile()) {
+        log_.write(logLevelError, __func__,
+                   "%s holds entitlements that could not be read; references cannot be counted", lost->c_str());
+        return std::nullopt;
+    }
+    return referencesIn(map, type, LogFlag::yes);
+}
+
+void ZORGroupManager::handleChangeFromOldGroupContainerIds(Identifiers oldGroups, const Identifiers& newGroups,
+                                                           GroupType type, const std::string& identifier,
+                                                           const plist::Dictionary& map) {
+    if (!oldGroups || oldGroups == newGroups)
+        return;
+    if (newGroups)
+        std::erase_if(*oldGroups, [&](const std::string& group) {
+            return std::ranges::find(*newGroups, group) != newGroups->end();
+        });
+    _removeReferenceForGroupIdentifiers(*oldGroups, type, identifier, map);
+}
+
+void ZORGroupManager::_removeReferenceForGroupIdentifiers(const std::vector<std::string>& groups, GroupType type,
+                                                          const std::string& identifier, const plist::Dictionary& map) {
+    if (groups.empty())
+        return;
+    const auto references = _copyReferenceCountSetOfType(type, map);
+    if (!references) {
+        log_.write(logLevelError, __func__, "Failed to get reference count information for group type: %ld",
+                   static_cast<long>(type));
+        return;
+    }
+    forEachUser(type, [&](std::uint32_t userId) {
+        for (const std::string& group : groups)
+            _removeGroupContainersIfNeededforUser(userId, kindOf(type).containerClass, group, identifier, *references);
+    });
+}
+
+void ZORGroupManager::_removeGroupContainersIfNeededforUser(std::uint32_t userId, ContainerClass containerClass,
+                                                            const std::string& group, const std::string& identifier,
+                                                            const References& references) {
+    const auto holders = references.find(group);
+    const std::size_t count = holders == references.end() ? 0 : holders->second.size();
+    // A list that is malformed gives its identifier groups that are not counted for it: the one reference to such a
+    // group is somebody else's.
+    if (count != 1 || holders->second.front() != identifier) {
+        ZOR_LOG(log_, logLevelDebug, "Reference count for user: %u, ID: %s is %ld", userId, ZOR_SHOWN(group),
+                static_cast<long>(count));
+        return;
+    }
+    const auto record = services_.cache.containerForUser(userId, containerClass, &group, false);
+    if (!record) {
+        ZOR_LOG(log_, logLevelDebug, "Failed to retrieve group container %s for %u : %s.  May not exist for this user",
+                ZOR_SHOWN(group), userId, record.error().text().c_str());
+        return;
+    }
+    log_.write(logLevelNotice, __func__, "Last reference to group container %s for %u is going away; removing it.",
+               ZOR_SHOWN(group), userId);
+    stageGroupContainer(__func__, userId, **record, UseLocking::no);
+}
+
+void ZORGroupManager::stageGroupContainer(const char* function, std::uint32_t userId, const ZORMetadata& record,
+                                          UseLocking useLocking) {
+    const auto staged = services_.sharedClientConnection->stageForDeleteContainersWithUsers(
+        ZORClientConnection::DeletionBatch::of(userId, record.uuid(), record.identifier(), record.containerClass()),
+        useLocking);
+    if (!staged)
+        log_.write(logLevelError, function, "Failed to destroy group container with identifier %s for %u: %llu",
+                   ZOR_SHOWN(record.identifier()), userId, static_cast<unsigned long long>(staged.error().replyCode()));
+}
+
+void ZORGroupManager::reconcileGroupContainersOfType(GroupType type) {
+    const auto references = _copyReferenceCountSetOfType(type, services_.entitlements.entitlementMappingDict());
+    if (!references) {
+        log_.write(logLevelError, __func__, "Failed to get reference count information for group type: %ld",
+                   static_cast<long>(type));
+        return;
+    }
+    forEachUser(type, [&](std::uint32_t userId) {
+        _cleanupUnreferencedGroupContainersForUser(userId, kindOf(type).containerClass, *references);
+    });
+}
+
+void ZORGroupManager::_cleanupUnreferencedGroupContainersForUser(std::uint32_t userId, ContainerClass containerClass,
+                                                                 const References& references) {
+    const auto records = services_.cache.allContainersForUser(userId, containerClass, false);
+    if (!records) {
+        log_.write(logLevelError, __func__, "Failed to fetch group container list for %u: %s", userId,
+                   records.error().text().c_str());
+        return;
+    }
+    for (const auto& record : *records) {
+        if (references.contains(record->identifier()))
+            continue;
+        log_.write(logLevelError, __func__, "Removing group container with identifier %s for %u",
+                   ZOR_SHOWN(record->identifier()), userId);
+        stageGroupContainer(__func__, userId, *record, UseLocking::yes);
+    }
+}
+
+Result<ZORGroupManager::Paths> ZORGroupManager::groupContainerPathsForUser(std::uint32_t userId,
+                                                                           ZORClientConnection& clientConnection,
+                                                                           const std::string* identifier) {
+    constexpr Here here{"groupContainerPathsForUser", __LINE__};
+    return services_.boundary.run(here, [&]() -> Result<Paths> {
+        if (!identifier)
+            return makeError(log_, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
+                             "Can't act on an invalid object: userId: %u, ID: %s", userId, "(null)");
+        const auto groupFailed = [&](const ZORError& error) {
+            log_.write(logLevelError, here.function,
+                       "Failed to create or lookup group container-userId: %u, ID: %s : %llu", userId,
+                       ZOR_SHOWN(*identifier), static_cast<unsigned long long>(error.replyCode()));
+        };
+        std::vector<FoundContainer> containers;
+        {
+            const AllIdentifiersLock lock(services_.locks, LockMode::writing);
+            const bool system = userId == systemOwnerUserId;
+            const auto groups = system ? services_.entitlements.systemGroupIdentifiersForIdentifier(*identifier)
+                                       : services_.entitlements.appGroupIdentifiersForIdentifier(*identifier);
+            // Whoever may ask at all may ask for any identifier's: a path opens nothing, its directory has an owner.
+            clientConnection.setAllowGroupIdLookup(true);
+            for (const std::string& group : groups.value_or(std::vector<std::string>())) {
+                auto found = clientConnection.createOrLookupContainerForUser(
+                    userId, &group, system ? ContainerClass::sharedSystemGroup : ContainerClass::sharedAppGroup,
+                    {.createIfNecessary = true, .transient = false, .useLocking = UseLocking::no});
+                if (found)
+                    containers.push_back(std::move(*found));
+                else
+                    groupFailed(found.error());
+            }
+        }
+        Paths paths;
+        for (const FoundContainer& container : containers)
+            if (const auto synced = clientConnection.makeDurable(container))
+                paths.emplace(container.record->identifier(), container.path);
+            else
+                groupFailed(synced.error());
+        return paths;
+    });
+}
+
+Result<std::vector<std::string>> ZORGroupManager::groupContainerIdentifiersForUser(std::uint32_t userId,
+                                                                                   const std::string* identifier) {
+    constexpr Here here{"groupContainerIdentifiersForUser", __LINE__};
+    return services_.boundary.run(here, [&]() -> Result<std::vector<std::string>> {
+        if (!identifier)
+            return makeError(log_, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
+                             "Can't act on an invalid object: userId: %u, ID: %s", userId, "(null)");
+        const AllIdentifiersLock lock(services_.locks, LockMode::writing);
+        return services_.entitlements.appGroupIdentifiersForIdentifier(*identifier)
+            .value_or(std::vector<std::string>());
+    });
+}
+
+} // namespace zor
