@@ -8,6 +8,8 @@
 #include "ipc/Uuid.h"
 
 #include <charconv>
+#include <type_traits>
+#include <utility>
 
 namespace zorvane {
 
@@ -68,6 +70,68 @@ Value converted(const plist::Value& value) {
     return made;
 }
 
+plist::Value unconverted(const Value& value);
+
+plist::Dictionary unconverted(const Map& map) {
+    plist::Dictionary dictionary;
+    for (const auto& [key, element] : map)
+        dictionary.set(key, unconverted(element));
+    return dictionary;
+}
+
+plist::Value unconverted(const Value& value) {
+    return std::visit(
+        [](const auto& content) -> plist::Value {
+            using Content = std::decay_t<decltype(content)>;
+            if constexpr (std::is_same_v<Content, List>) {
+                plist::Array array;
+                for (const Value& element : content)
+                    array.push_back(unconverted(element));
+                return array;
+            } else if constexpr (std::is_same_v<Content, Map>) {
+                return unconverted(content);
+            } else {
+                return plist::Value(content);
+            }
+        },
+        value.content);
+}
+
+void setIdentifier(plist::Dictionary& message, const std::string& identifier) {
+    if (!identifier.empty())
+        message.set(keys::identifier, identifier);
+}
+
+Result<void> withoutContent(const Result<plist::Dictionary>& reply) {
+    if (!reply)
+        return std::unexpected(reply.error());
+    return {};
+}
+
+Result<std::string> pathIn(const Result<plist::Dictionary>& reply) {
+    if (!reply)
+        return std::unexpected(reply.error());
+    const std::string* path = reply->string(keys::replyPath);
+    if (!path)
+        return incomplete();
+    return *path;
+}
+
+Result<Client::GroupPaths> groupPathsIn(const Result<plist::Dictionary>& reply) {
+    if (!reply)
+        return std::unexpected(reply.error());
+    const plist::Dictionary* groups = reply->dictionary(keys::replyGroupContainerDict);
+    if (!groups)
+        return incomplete();
+    Client::GroupPaths paths;
+    for (const auto& [group, path] : *groups) {
+        if (!path.asString())
+            return incomplete();
+        paths.emplace(group, *path.asString());
+    }
+    return paths;
+}
+
 } // namespace
 
 std::optional<std::uint64_t> containerClassOf(std::string_view nameOrNumber) {
@@ -122,8 +186,7 @@ Result<Container> Client::createOrLookup(const Lookup& lookup) {
     plist::Dictionary message = request(ipc::Command::createOrLookupContainer);
     message.set(keys::containerClass, lookup.containerClass);
     message.set(keys::userId, lookup.user);
-    if (!lookup.identifier.empty())
-        message.set(keys::identifier, lookup.identifier);
+    setIdentifier(message, lookup.identifier);
     message.set(keys::createIfNecessary, lookup.create);
     message.set(keys::transient, lookup.transient);
     const auto reply = connection_->call(message);
@@ -163,10 +226,96 @@ Result<std::vector<ListedContainer>> Client::list(std::uint64_t containerClass, 
 }
 
 Result<void> Client::emptyDeathRow() {
-    const auto reply = connection_->call(request(ipc::Command::deleteContainersOnDeathRow));
+    return withoutContent(connection_->call(request(ipc::Command::deleteContainersOnDeathRow)));
+}
+
+Result<void> Client::stageForDelete(const std::vector<Deletion>& deletions) {
+    plist::Array classes;
+    plist::Array users;
+    plist::Array identifiers;
+    plist::Array uuids;
+    for (const Deletion& deletion : deletions) {
+        classes.emplace_back(deletion.containerClass);
+        users.emplace_back(deletion.user);
+        identifiers.emplace_back(deletion.identifier);
+        uuids.push_back(ipc::uuidValue(deletion.uuid));
+    }
+    plist::Dictionary message = request(ipc::Command::stageContainersForDelete);
+    message.set(keys::containerClassesArray, std::move(classes));
+    message.set(keys::userIdsArray, std::move(users));
+    message.set(keys::identifiersArray, std::move(identifiers));
+    message.set(keys::uuidsArray, std::move(uuids));
+    return withoutContent(connection_->call(message));
+}
+
+Result<void> Client::deleteContainer(std::uint64_t containerClass, std::uint32_t user, const std::string& identifier,
+                                     bool transient) {
+    plist::Dictionary message = request(ipc::Command::deleteContainer);
+    message.set(keys::containerClass, containerClass);
+    message.set(keys::userId, user);
+    message.set(keys::identifier, identifier);
+    message.set(keys::transient, transient);
+    return withoutContent(connection_->call(message));
+}
+
+Result<Client::GroupPaths> Client::groupContainerPaths(std::uint32_t user, const std::string& identifier) {
+    plist::Dictionary message = request(ipc::Command::getGroupContainerPaths);
+    message.set(keys::userId, user);
+    setIdentifier(message, identifier);
+    return groupPathsIn(connection_->call(message));
+}
+
+Result<std::vector<std::string>> Client::groupContainerIdentifiers(std::uint32_t user, const std::string& identifier) {
+    plist::Dictionary message = request(ipc::Command::getGroupContainerIdentifiers);
+    message.set(keys::userId, user);
+    setIdentifier(message, identifier);
+    const auto reply = connection_->call(message);
     if (!reply)
         return std::unexpected(reply.error());
-    return {};
+    const plist::Array* array = reply->array(keys::replyGroupIdentifiersArray);
+    if (!array)
+        return incomplete();
+    std::vector<std::string> groups;
+    for (const plist::Value& element : *array) {
+        if (!element.asString())
+            return incomplete();
+        groups.push_back(*element.asString());
+    }
+    return groups;
+}
+
+Result<std::string> Client::systemContainerPath(const std::string& identifier) {
+    plist::Dictionary message = request(ipc::Command::getSystemContainerPath);
+    setIdentifier(message, identifier);
+    return pathIn(connection_->call(message));
+}
+
+Result<Client::GroupPaths> Client::systemGroupContainerPaths(const std::string& identifier) {
+    plist::Dictionary message = request(ipc::Command::getSystemGroupContainerPaths);
+    setIdentifier(message, identifier);
+    return groupPathsIn(connection_->call(message));
+}
+
+Result<std::string> Client::systemGroupContainerPath(const std::string& groupIdentifier,
+                                                     const std::string& identifier) {
+    plist::Dictionary message = request(ipc::Command::getSystemGroupContainerPath);
+    message.set(keys::groupIdentifier, groupIdentifier);
+    setIdentifier(message, identifier);
+    return pathIn(connection_->call(message));
+}
+
+Result<void> Client::processEntitlements(const Registration& registration) {
+    plist::Dictionary options;
+    if (!registration.parentIdentifier.empty())
+        options.set(keys::parentBundleIdOption, registration.parentIdentifier);
+    if (registration.placeholder)
+        options.set(keys::placeholderOption, true);
+    plist::Dictionary message = request(ipc::Command::processEntitlements);
+    message.set(keys::identifier, registration.identifier);
+    message.set(keys::optionsDictionary, std::move(options));
+    if (registration.entitlements)
+        message.set(keys::entitlements, unconverted(*registration.entitlements));
+    return withoutContent(connection_->call(message));
 }
 
 Result<Value> status(const ConnectOptions& options) {

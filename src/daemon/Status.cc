@@ -33,12 +33,31 @@ plist::Dictionary describe(const platform::Identity& identity) {
 
 } // namespace
 
-plist::Dictionary Status::forPeer(platform::Peer& peer) {
+plist::Dictionary Status::forPeer(platform::Peer& peer, platform::StatusSocket::Detail detail) {
     plist::Dictionary status{
         {std::string(ipc::keys::statusPeer), describe(peer.identify(platform::Peer::Explain::yes))}};
-    if (composition_.platform().peers.ownsRoot(peer.kernelUserId()))
-        status.set(ipc::keys::statusCounters, counters());
+    if (!composition_.platform().peers.ownsRoot(peer.kernelUserId()))
+        return status;
+    status.set(ipc::keys::statusCounters, counters());
+    if (detail == platform::StatusSocket::Detail::full)
+        addEntitlements(status);
+    else
+        status.set(ipc::keys::statusEntitlementsLeftOut, true);
     return status;
+}
+
+void Status::addEntitlements(plist::Dictionary& status) {
+    plist::Dictionary map = composition_.entitlements().entitlementMappingDict();
+    const auto references = [&](GroupType type) {
+        std::vector<plist::Dictionary::Entry> groups;
+        for (const auto& [group, holders] : composition_.groups().referencesIn(map, type, LogFlag::no))
+            groups.emplace_back(group, plist::Array(holders.begin(), holders.end()));
+        return plist::Dictionary::fromUnsorted(std::move(groups));
+    };
+    status.set(ipc::keys::statusGroupReferences,
+               plist::Dictionary{{std::string(ipc::keys::statusApplicationGroups), references(GroupType::application)},
+                                 {std::string(ipc::keys::statusSystemGroups), references(GroupType::system)}});
+    status.set(ipc::keys::statusEntitlements, std::move(map));
 }
 
 plist::Dictionary Status::counters() {

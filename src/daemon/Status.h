@@ -5,6 +5,7 @@
 
 #include "daemon/Composition.h"
 #include "platform/PeerIdentity.h"
+#include "platform/linux/StatusSocket.h"
 #include "plist/Value.h"
 
 #include <functional>
@@ -17,11 +18,13 @@ public:
     Status(Composition& composition, std::function<void(plist::Dictionary&)> platformCounters)
         : composition_(composition), platformCounters_(std::move(platformCounters)) {}
 
-    /// The dictionary for one peer: "Peer", and "Counters" where the peer may know them.
-    [[nodiscard]] plist::Dictionary forPeer(platform::Peer& peer);
+    /// The dictionary for one peer: "Peer"; and, where the peer may know them, "Counters" and, in full detail, the
+    /// entitlement map and what it makes of groups.
+    [[nodiscard]] plist::Dictionary forPeer(platform::Peer& peer, platform::StatusSocket::Detail detail);
 
 private:
     [[nodiscard]] plist::Dictionary counters();
+    void addEntitlements(plist::Dictionary& status);
 
     Composition& composition_;
     const std::function<void(plist::Dictionary&)> platformCounters_;

@@ -123,8 +123,9 @@ int main(int argumentCount, char** arguments) {
     Composition composition((*platform)->roles());
     const auto notify = platform::NotifySocket::ofEnvironment();
     Status status(composition, [&](plist::Dictionary& counters) { addPlatformCounters(**platform, counters); });
-    platform::StatusSocket statusSocket((*platform)->peers(), (*platform)->runLoop(),
-                                        [&](platform::Peer& peer) { return status.forPeer(peer); });
+    platform::StatusSocket statusSocket(
+        (*platform)->peers(), (*platform)->runLoop(),
+        [&](platform::Peer& peer, platform::StatusSocket::Detail detail) { return status.forPeer(peer, detail); });
     Daemon daemon(composition, {.logLevel = options->logLevel, .ready = [&] {
                                     openStatus(**platform, statusSocket, composition.log());
                                     (void)notify.send("READY=1");

@@ -13,6 +13,7 @@
 #pragma once
 
 #include "daemon/base/Result.h"
+#include "ipc/Keys.h"
 #include "platform/Mutex.h"
 #include "plist/Value.h"
 #include "store/StoreServices.h"
@@ -28,8 +29,9 @@ namespace zor {
 /// Keys of the map that are no identifiers.
 namespace entitlementMapKeys {
 inline constexpr std::string_view childPluginBundleIds = "com.veltra.Zorvane.ChildPluginBundleIDs";
-inline constexpr std::string_view registeredByCaller = "com.veltra.Zorvane.EntitlementsRegisteredByCaller";
-inline constexpr std::string_view placeholder = "com.veltra.Zorvane.PlaceholderEntitlements";
+// The flags are kept under the names of the options that set them.
+inline constexpr std::string_view registeredByCaller = ipc::keys::registeredByCallerOption;
+inline constexpr std::string_view placeholder = ipc::keys::placeholderOption;
 } // namespace entitlementMapKeys
 
 /// Keys inside an identifier's entitlements.

@@ -9,6 +9,7 @@
 #include "daemon/base/UserIdentity.h"
 #include "entitlements/ZOREntitlementMapping.h"
 #include "entitlements/ZORGroupManager.h"
+#include "ipc/Keys.h"
 #include "store/StoreServices.h"
 
 #include <algorithm>
@@ -21,7 +22,6 @@ using platform::MutexLock;
 namespace {
 
 constexpr const char* processFunction = "_onQueue_processEntitlements";
-constexpr std::string_view parentBundleIdOption = "com.veltra.Zorvane.ParentBundleID";
 
 bool isReserved(std::string_view key) {
     return key == entitlementMapKeys::childPluginBundleIds || key == entitlementMapKeys::registeredByCaller ||
@@ -43,7 +43,7 @@ void ZOREntitlementMapping::StagedChange::add(std::string_view key, plist::Dicti
 void ZOREntitlementMapping::_onQueue_stageChildBundles(StagedChange& staged, const std::string& identifier,
                                                        const plist::Dictionary* options, SayStaging say) const {
     const plist::Dictionary* stored = entitlementMappingDict_.dictionary(entitlementMapKeys::childPluginBundleIds);
-    const std::string* parent = options ? options->string(parentBundleIdOption) : nullptr;
+    const std::string* parent = options ? options->string(ipc::keys::parentBundleIdOption) : nullptr;
     if (!parent) {
         if (!stored || !stored->find(identifier))
             return;
@@ -160,7 +160,7 @@ ErrorCode ZOREntitlementMapping::_onQueue_processEntitlements(const plist::Dicti
                                                               const plist::Dictionary* options) {
     if (!identifier)
         return ErrorCode::identifierMissing;
-    const plist::Value* parent = options ? options->find(parentBundleIdOption) : nullptr;
+    const plist::Value* parent = options ? options->find(ipc::keys::parentBundleIdOption) : nullptr;
     if (isReserved(*identifier) || (parent && !parent->asString())) {
         makeError(log_, {processFunction, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
                   "Can't act on an invalid object: ID: %s, parent ID: %s", ZOR_SHOWN(*identifier),

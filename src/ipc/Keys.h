@@ -72,6 +72,12 @@ inline constexpr std::string_view dataProtectionClass = "DataProtectionClass";  
 inline constexpr std::string_view isThirdParty = "IsThirdParty";                   // boolean
 inline constexpr std::string_view retryIfLocked = "RetryIfLocked";                 // boolean
 
+// Options of processEntitlements.
+inline constexpr std::string_view parentBundleIdOption = "com.veltra.Zorvane.ParentBundleID"; // string
+inline constexpr std::string_view registeredByCallerOption =
+    "com.veltra.Zorvane.EntitlementsRegisteredByCaller";                                            // boolean
+inline constexpr std::string_view placeholderOption = "com.veltra.Zorvane.PlaceholderEntitlements"; // boolean
+
 // Replies.
 inline constexpr std::string_view replyError = "ReplyError";                                 // u64, in every reply
 inline constexpr std::string_view replyUUID = "ReplyUUID";                                   // UUID
@@ -90,6 +96,14 @@ inline constexpr std::string_view replyGroupIdentifiersArray = "ReplyGroupIdenti
 // The status reply.
 inline constexpr std::string_view statusPeer = "Peer";         // dictionary
 inline constexpr std::string_view statusCounters = "Counters"; // dictionary
+/// Dictionary: identifier to entitlements, and the keys that the entitlement map keeps for itself.
+inline constexpr std::string_view statusEntitlements = "Entitlements";
+/// Dictionary: "Application" and "System" to dictionaries of group identifier to an array of the identifiers that list
+/// it, one for each time that they do.
+inline constexpr std::string_view statusGroupReferences = "GroupReferences";
+inline constexpr std::string_view statusApplicationGroups = "Application";
+inline constexpr std::string_view statusSystemGroups = "System";
+inline constexpr std::string_view statusEntitlementsLeftOut = "EntitlementsLeftOut"; // boolean
 
 } // namespace keys
 

@@ -8,6 +8,7 @@
 #include <cstdint>
 #include <optional>
 #include <string>
+#include <vector>
 
 namespace zorvanectl {
 
@@ -19,10 +20,38 @@ struct Target {
     bool transient = false;
 };
 
+// ContainerCommands.cc
 int create(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
 int lookup(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
 int list(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
+/// Those of a class; all of them are there, or none goes.
+int deleteContainers(const zorvane::ConnectOptions& connect, const Output& output, const Target& target,
+                     const std::vector<std::string>& identifiers);
 int emptyDeathRow(const zorvane::ConnectOptions& connect, const Output& output);
 int status(const zorvane::ConnectOptions& connect, const Output& output);
+
+// EntitlementCommands.cc
+struct Registration {
+    std::string identifier;
+    /// A file with a JSON object of entitlements; "-" is standard input; empty: none.
+    std::string file;
+    std::vector<std::string> applicationGroups;
+    std::vector<std::string> systemGroups;
+    bool systemContainer = false;
+    std::string parent;
+    bool placeholder = false;
+};
+int setEntitlements(const zorvane::ConnectOptions& connect, const Output& output, const Registration& registration);
+int showEntitlements(const zorvane::ConnectOptions& connect, const Output& output, const std::string& identifier);
+int clearEntitlements(const zorvane::ConnectOptions& connect, const Output& output, const std::string& identifier);
+
+// GroupCommands.cc. An empty identifier is this program's own.
+int groups(const zorvane::ConnectOptions& connect, const Output& output, std::uint32_t user,
+           const std::string& identifier);
+int systemPath(const zorvane::ConnectOptions& connect, const Output& output, const std::string& identifier);
+int systemGroupPath(const zorvane::ConnectOptions& connect, const Output& output, const std::string& group,
+                    const std::string& identifier);
+/// Who holds the groups of an identifier, and what goes when it goes.
+int why(const zorvane::ConnectOptions& connect, const Output& output, const std::string& identifier);
 
 } // namespace zorvanectl

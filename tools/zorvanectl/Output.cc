@@ -9,8 +9,8 @@ namespace zorvanectl {
 namespace {
 
 // Names are bytes; what is not UTF-8 is shown as a replacement character rather than ending the program.
-std::string dumped(const nlohmann::json& document) {
-    return document.dump(2, ' ', false, nlohmann::json::error_handler_t::replace);
+std::string dumped(const nlohmann::json& document, int indent = 2) {
+    return document.dump(indent, ' ', false, nlohmann::json::error_handler_t::replace);
 }
 
 const char* kindName(zorvane::Error::Kind kind) {
@@ -50,6 +50,14 @@ const char* adviceFor(const zorvane::Error& error) {
 
 int exitCodeOf(const zorvane::Error& error) {
     return error.kind == zorvane::Error::Kind::daemon ? exitDaemonError : exitUnreachable;
+}
+
+std::string shown(const zorvane::Value& value) {
+    if (const auto* text = std::get_if<std::string>(&value.content))
+        return printable(*text);
+    if (const auto* boolean = std::get_if<bool>(&value.content))
+        return *boolean ? "yes" : "no";
+    return dumped(toJson(value), -1);
 }
 
 } // namespace
@@ -92,6 +100,17 @@ void Output::table(const std::vector<std::string>& header, const std::vector<std
     print(header);
     for (const auto& row : rows)
         print(row);
+}
+
+void Output::tree(const std::string& name, const zorvane::Value& value, const std::string& indent) const {
+    const auto* map = std::get_if<zorvane::Map>(&value.content);
+    if (!map) {
+        line(indent + printable(name) + ": " + shown(value));
+        return;
+    }
+    line(indent + printable(name) + ":");
+    for (const auto& [key, element] : *map)
+        tree(key, element, indent + "  ");
 }
 
 int Output::error(const zorvane::Error& error, const std::string& while_) const {

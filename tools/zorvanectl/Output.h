@@ -29,6 +29,8 @@ public:
     void line(const std::string& text) const;
     /// Columns as wide as their widest cell, the header first; nothing but the header when there are no rows.
     void table(const std::vector<std::string>& header, const std::vector<std::vector<std::string>>& rows) const;
+    /// A name and what is under it, a line each, deeper ones indented.
+    void tree(const std::string& name, const zorvane::Value& value, const std::string& indent = "") const;
     /// Says what failed, what that means and what to do. The exit code for it.
     [[nodiscard]] int error(const zorvane::Error& error, const std::string& while_) const;
 

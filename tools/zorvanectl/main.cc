@@ -4,6 +4,7 @@
 #include "Output.h"
 
 #include <CLI/CLI.hpp>
+#include <functional>
 
 namespace {
 
@@ -14,6 +15,9 @@ Examples:
   zorvanectl create org.example.notes --class data-app
   zorvanectl lookup org.example.notes --class 2 --user 501 --json
   zorvanectl list --class Bundle/Application
+  zorvanectl delete org.example.notes org.example.maps --class data-app
+  zorvanectl entitlements set org.example.notes --app-group group.org.example
+  zorvanectl why org.example.notes
   zorvanectl status
 
 Classes, by number, name, or the beginning of one name in lower case (data-app):
@@ -32,6 +36,9 @@ struct Arguments {
     std::string className;
     std::uint32_t user = 0;
     Target target;
+    std::vector<std::string> identifiers;
+    std::string group;
+    Registration registration;
 };
 
 /// Accepts what containerClassOf knows, with an error that lists nothing twice: --help does.
@@ -55,10 +62,110 @@ void finishTarget(const CLI::App& command, Arguments& arguments) {
         arguments.target.user = arguments.user;
 }
 
+/// What the command line asks for, to be done once it is parsed as a whole.
+using Action = std::function<int(const Output&)>;
+
+void addContainerCommands(CLI::App& app, Arguments& arguments, Action& action) {
+    const auto make = [&](const char* name, const char* help, auto&& run) {
+        CLI::App* command = app.add_subcommand(name, help);
+        command->callback([&arguments, &action, command, run] {
+            if (command->get_option_no_throw("--class"))
+                finishTarget(*command, arguments);
+            action = [&arguments, run](const Output& output) { return run(arguments, output); };
+        });
+        return command;
+    };
+    CLI::App* create =
+        make("create", "Make a container, or find the one that is there",
+             [](const Arguments& a, const Output& o) { return zorvanectl::create(a.connect, o, a.target); });
+    CLI::App* lookup = make("lookup", "Find a container", [](const Arguments& a, const Output& o) {
+        return zorvanectl::lookup(a.connect, o, a.target);
+    });
+    for (CLI::App* command : {create, lookup})
+        command->add_option("identifier", arguments.target.identifier, "Identifier; without it, this program's own");
+    CLI::App* list = make("list", "List the containers of a class",
+                          [](const Arguments& a, const Output& o) { return zorvanectl::list(a.connect, o, a.target); });
+    CLI::App* remove = make("delete", "Delete containers of a class: all those named, or none",
+                            [](const Arguments& a, const Output& o) {
+                                return zorvanectl::deleteContainers(a.connect, o, a.target, a.identifiers);
+                            });
+    remove->add_option("identifiers", arguments.identifiers, "Identifiers")->required();
+    for (CLI::App* command : {create, lookup, list, remove})
+        addTargetOptions(*command, arguments);
+    make("empty-death-row", "Delete what waits for deletion, and wait for it",
+         [](const Arguments& a, const Output& o) { return zorvanectl::emptyDeathRow(a.connect, o); });
+    make("status", "Show whom the daemon takes this program for, and how it is doing",
+         [](const Arguments& a, const Output& o) { return zorvanectl::status(a.connect, o); });
+}
+
+void addEntitlementCommands(CLI::App& app, Arguments& arguments, Action& action) {
+    Registration& registration = arguments.registration;
+    CLI::App* entitlements = app.add_subcommand("entitlements", "What an identifier is entitled to");
+    entitlements->require_subcommand(1);
+    const auto make = [&](const char* name, const char* help, auto&& run) {
+        CLI::App* command = entitlements->add_subcommand(name, help);
+        command->add_option("identifier", registration.identifier, "Identifier")->required();
+        command->callback([&arguments, &action, run] {
+            action = [&arguments, run](const Output& output) { return run(arguments, output); };
+        });
+        return command;
+    };
+    CLI::App* set =
+        make("set", "Register entitlements in place of those that are there", [](const Arguments& a, const Output& o) {
+            return zorvanectl::setEntitlements(a.connect, o, a.registration);
+        });
+    set->add_option("--from", registration.file, "File with a JSON object of entitlements; - is standard input");
+    set->add_option("--app-group", registration.applicationGroups, "Application group; may repeat");
+    set->add_option("--system-group", registration.systemGroups, "System group (systemgroup.…); may repeat");
+    set->add_flag("--system-container", registration.systemContainer, "It owns a system container");
+    set->add_option("--parent", registration.parent, "It is a child (an extension) of this identifier");
+    set->add_flag("--placeholder", registration.placeholder, "The entitlements are a placeholder");
+    make("show", "Show what is registered; for the owner of the daemon's root",
+         [](const Arguments& a, const Output& o) {
+             return zorvanectl::showEntitlements(a.connect, o, a.registration.identifier);
+         });
+    make("clear", "Remove what is registered, with the containers that go with it",
+         [](const Arguments& a, const Output& o) {
+             return zorvanectl::clearEntitlements(a.connect, o, a.registration.identifier);
+         });
+}
+
+void addGroupCommands(CLI::App& app, Arguments& arguments, Action& action) {
+    const auto make = [&](const char* name, const char* help, auto&& run) {
+        CLI::App* command = app.add_subcommand(name, help);
+        command->callback([&arguments, &action, run] {
+            action = [&arguments, run](const Output& output) { return run(arguments, output); };
+        });
+        return command;
+    };
+    const char* ownByDefault = "Identifier; without it, this program's own";
+    CLI::App* groups = make("groups", "Paths of an identifier's group containers, made where they are missing",
+                            [](const Arguments& a, const Output& o) {
+                                return zorvanectl::groups(a.connect, o, a.user, a.target.identifier);
+                            });
+    groups->add_option("-u,--user", arguments.user, "User id; 1 is the current mobile user")
+        ->default_val(zorvane::currentMobileUser);
+    CLI::App* systemPath = make(
+        "system-path", "Path of an identifier's system container, made where it is missing",
+        [](const Arguments& a, const Output& o) { return zorvanectl::systemPath(a.connect, o, a.target.identifier); });
+    CLI::App* systemGroupPath =
+        make("system-group-path", "Path of a system group's container", [](const Arguments& a, const Output& o) {
+            return zorvanectl::systemGroupPath(a.connect, o, a.group, a.target.identifier);
+        });
+    systemGroupPath->add_option("group", arguments.group, "System group identifier")->required();
+    for (CLI::App* command : {groups, systemPath, systemGroupPath})
+        command->add_option("identifier", arguments.target.identifier, ownByDefault);
+    CLI::App* why =
+        make("why", "Who holds an identifier's groups, and what would go if it went",
+             [](const Arguments& a, const Output& o) { return zorvanectl::why(a.connect, o, a.target.identifier); });
+    why->add_option("identifier", arguments.target.identifier, "Identifier")->required();
+}
+
 } // namespace
 
 int main(int argumentCount, char** argumentValues) {
     Arguments arguments;
+    Action action;
     CLI::App app("Talks to zorvaned, the container manager.", "zorvanectl");
     app.set_version_flag("--version", "zorvanectl " ZORVANE_VERSION);
     app.add_option("--root", arguments.connect.root, "System root of the daemon")->capture_default_str();
@@ -68,35 +175,13 @@ int main(int argumentCount, char** argumentValues) {
     app.require_subcommand(1);
     app.fallthrough();
     app.footer(footer);
-
-    CLI::App* create = app.add_subcommand("create", "Make a container, or find the one that is there");
-    CLI::App* lookup = app.add_subcommand("lookup", "Find a container");
-    for (CLI::App* command : {create, lookup}) {
-        command->add_option("identifier", arguments.target.identifier, "Identifier; without it, this program's own");
-        addTargetOptions(*command, arguments);
-    }
-    CLI::App* list = app.add_subcommand("list", "List the containers of a class");
-    addTargetOptions(*list, arguments);
-    CLI::App* emptyDeathRow = app.add_subcommand("empty-death-row", "Delete what waits for deletion, and wait for it");
-    CLI::App* status = app.add_subcommand("status", "Show whom the daemon takes this program for, and how it is doing");
-
+    addContainerCommands(app, arguments, action);
+    addEntitlementCommands(app, arguments, action);
+    addGroupCommands(app, arguments, action);
     try {
         app.parse(argumentCount, argumentValues);
     } catch (const CLI::ParseError& error) {
         return app.exit(error) == 0 ? exitDone : exitUsage;
     }
-
-    const Output output(arguments.json ? Format::json : Format::people);
-    for (const CLI::App* command : {create, lookup, list})
-        if (command->parsed())
-            finishTarget(*command, arguments);
-    if (create->parsed())
-        return zorvanectl::create(arguments.connect, output, arguments.target);
-    if (lookup->parsed())
-        return zorvanectl::lookup(arguments.connect, output, arguments.target);
-    if (list->parsed())
-        return zorvanectl::list(arguments.connect, output, arguments.target);
-    if (emptyDeathRow->parsed())
-        return zorvanectl::emptyDeathRow(arguments.connect, output);
-    return status->parsed() ? zorvanectl::status(arguments.connect, output) : exitUsage;
+    return action ? action(Output(arguments.json ? Format::json : Format::people)) : exitUsage;
 }

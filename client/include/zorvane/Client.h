@@ -17,6 +17,7 @@
 #include <array>
 #include <cstdint>
 #include <expected>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -84,6 +85,43 @@ public:
     /// Code 21: there is none, and it was not to be made.
     [[nodiscard]] Result<Container> createOrLookup(const Lookup& lookup);
 
+    struct Deletion {
+        std::uint64_t containerClass = 0;
+        std::uint32_t user = currentMobileUser;
+        std::string identifier;
+        std::array<std::uint8_t, 16> uuid{};
+    };
+    /// Takes containers out of the store; their files go when death row is emptied. What is not there is skipped.
+    [[nodiscard]] Result<void> stageForDelete(const std::vector<Deletion>& deletions);
+    /// The same for the one container of an identifier. Code 21: there is none.
+    [[nodiscard]] Result<void> deleteContainer(std::uint64_t containerClass, std::uint32_t user,
+                                               const std::string& identifier, bool transient);
+
+    // Shared containers. An empty identifier is the caller's own; paths are of containers that are made when they are
+    // first asked for.
+    /// Group identifier to path.
+    using GroupPaths = std::map<std::string, std::string>;
+    [[nodiscard]] Result<GroupPaths> groupContainerPaths(std::uint32_t user, const std::string& identifier);
+    [[nodiscard]] Result<std::vector<std::string>> groupContainerIdentifiers(std::uint32_t user,
+                                                                             const std::string& identifier);
+    /// Code 55: the identifier is not entitled to one.
+    [[nodiscard]] Result<std::string> systemContainerPath(const std::string& identifier);
+    [[nodiscard]] Result<GroupPaths> systemGroupContainerPaths(const std::string& identifier);
+    /// Codes 55: the caller is not entitled to the group; 21: it has no container.
+    [[nodiscard]] Result<std::string> systemGroupContainerPath(const std::string& groupIdentifier,
+                                                               const std::string& identifier);
+
+    struct Registration {
+        std::string identifier;
+        /// Without: what is registered for the identifier is removed, with the containers that go with it.
+        std::optional<Map> entitlements;
+        /// Not empty: the identifier is a child (an extension) of this one.
+        std::string parentIdentifier;
+        bool placeholder = false;
+    };
+    /// Replaces what is registered for an identifier.
+    [[nodiscard]] Result<void> processEntitlements(const Registration& registration);
+
     /// In no particular order.
     [[nodiscard]] Result<std::vector<ListedContainer>> list(std::uint64_t containerClass, std::uint32_t user,
                                                             bool transient);
@@ -100,7 +138,8 @@ private:
 };
 
 /// Whom the daemon takes this program for, and why ("Peer"); for the owner of the root also how it is doing
-/// ("Counters").
+/// ("Counters"), what is registered ("Entitlements") and who refers to which group ("GroupReferences"). The last two
+/// are missing when they are too long for the socket; "EntitlementsLeftOut" is then true.
 [[nodiscard]] Result<Value> status(const ConnectOptions& options);
 
 } // namespace zorvane

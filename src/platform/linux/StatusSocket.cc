@@ -19,7 +19,8 @@ namespace {
 constexpr unsigned answersPerTurn = 16;
 /// A socket takes this much without being asked to (net.core.wmem_default counts overhead too).
 constexpr std::size_t frameBytesSmall = std::size_t{64} * 1024;
-constexpr std::size_t frameBytesMax = std::size_t{1} << 20;
+/// A map of ten thousand identifiers, and less than a socket's buffer can be made.
+constexpr std::size_t frameBytesMax = std::size_t{16} << 20;
 
 } // namespace
 
@@ -85,24 +86,42 @@ void StatusSocket::answerAll() {
     }
 }
 
-void StatusSocket::answer(int socket) {
-    const std::unique_ptr<Peer> peer = identity_.peerOfSocket(socket);
-    if (!peer)
-        return;
+bool StatusSocket::makeFrame(Peer& peer, Detail detail) {
     frame_.resize(ipc::frameHeaderBytes);
-    if (!plist::appendBinary(build_(*peer), frame_) || frame_.size() > frameBytesMax)
-        return;
+    if (!plist::appendBinary(build_(peer, detail), frame_) || frame_.size() > frameBytesMax)
+        return false;
     const ipc::FrameHeader header = {.payloadBytes = static_cast<std::uint32_t>(frame_.size() - ipc::frameHeaderBytes),
                                      .flags = ipc::frameIsReply,
                                      .id = 0};
     ipc::encodeFrameHeader(header, std::span(frame_).first<ipc::frameHeaderBytes>());
-    if (frame_.size() > frameBytesSmall) {
-        // Privileged daemons may pass net.core.wmem_max; others get what it allows.
-        const int wanted = static_cast<int>(frame_.size());
-        if (::setsockopt(socket, SOL_SOCKET, SO_SNDBUFFORCE, &wanted, sizeof wanted) != 0)
-            ::setsockopt(socket, SOL_SOCKET, SO_SNDBUF, &wanted, sizeof wanted);
+    return true;
+}
+
+bool StatusSocket::fits(int socket) const {
+    if (frame_.size() <= frameBytesSmall)
+        return true;
+    // Privileged daemons may pass net.core.wmem_max; others get what it allows. The kernel doubles what it is asked
+    // for, to pay for its own overhead.
+    const int wanted = static_cast<int>(frame_.size());
+    if (::setsockopt(socket, SOL_SOCKET, SO_SNDBUFFORCE, &wanted, sizeof wanted) != 0)
+        ::setsockopt(socket, SOL_SOCKET, SO_SNDBUF, &wanted, sizeof wanted);
+    int granted = 0;
+    socklen_t length = sizeof granted;
+    return ::getsockopt(socket, SOL_SOCKET, SO_SNDBUF, &granted, &length) == 0 && granted / 2 >= wanted;
+}
+
+void StatusSocket::answer(int socket) {
+    const std::unique_ptr<Peer> peer = identity_.peerOfSocket(socket);
+    if (!peer)
+        return;
+    const bool whole = makeFrame(*peer, Detail::full) && fits(socket);
+    if (whole || makeFrame(*peer, Detail::brief)) {
+        [[maybe_unused]] const bool taken = fits(socket); // else the stream ends early
+        [[maybe_unused]] const ssize_t sent = ::send(socket, frame_.data(), frame_.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
     }
-    [[maybe_unused]] const ssize_t sent = ::send(socket, frame_.data(), frame_.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
+    // What one answer needed is not kept for the next, which is likely to need less.
+    if (frame_.capacity() > frameBytesSmall)
+        plist::Data().swap(frame_);
 }
 
 } // namespace zor::platform

@@ -2,8 +2,8 @@
 // The status socket: whoever connects gets one reply frame (id 0) and the end of the stream. Nothing is read, so there
 // is no request that could go wrong, and a program that is refused everywhere else can ask why.
 //
-// Everything happens on the run loop's thread and never blocks it: a reply that a new connection's buffer does not take
-// is cut.
+// Everything happens on the run loop's thread and never blocks it: of a reply that a new connection's buffer would not
+// take the brief form is sent.
 #pragma once
 
 #include "platform/PeerIdentity.h"
@@ -17,8 +17,10 @@ namespace zor::platform {
 
 class StatusSocket {
 public:
+    /// Without what may grow with the number of containers, or whole.
+    enum class Detail { brief, full };
     /// Makes the dictionary for one peer.
-    using Build = std::function<plist::Dictionary(Peer&)>;
+    using Build = std::function<plist::Dictionary(Peer&, Detail)>;
 
     StatusSocket(PeerIdentity& identity, RunLoop& runLoop, Build build);
     ~StatusSocket();
@@ -36,6 +38,10 @@ private:
     [[nodiscard]] int serve();
     void answerAll();
     void answer(int socket);
+    /// False when it cannot be written as a frame.
+    [[nodiscard]] bool makeFrame(Peer& peer, Detail detail);
+    /// Asks for a buffer that takes the frame; whether the socket has one then.
+    [[nodiscard]] bool fits(int socket) const;
 
     PeerIdentity& identity_;
     RunLoop& runLoop_;

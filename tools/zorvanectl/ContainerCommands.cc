@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Commands.h"
+#include "RegisteredEntitlements.h"
 
 #include <algorithm>
 
@@ -45,24 +46,8 @@ int createOrLookup(const zorvane::ConnectOptions& connect, const Output& output,
     return exitDone;
 }
 
-std::string shown(const zorvane::Value& value) {
-    if (const auto* text = std::get_if<std::string>(&value.content))
-        return printable(*text);
-    if (const auto* boolean = std::get_if<bool>(&value.content))
-        return *boolean ? "yes" : "no";
-    return toJson(value).dump();
-}
-
-void printTree(const Output& output, const std::string& name, const zorvane::Value& value, const std::string& indent) {
-    const auto* map = std::get_if<zorvane::Map>(&value.content);
-    if (!map) {
-        output.line(indent + printable(name) + ": " + shown(value));
-        return;
-    }
-    output.line(indent + printable(name) + ":");
-    for (const auto& [key, element] : *map)
-        printTree(output, key, element, indent + "  ");
-}
+/// The daemon's code for a container that is not there.
+constexpr std::uint64_t codeNotFound = 21;
 
 } // namespace
 
@@ -97,6 +82,42 @@ int list(const zorvane::ConnectOptions& connect, const Output& output, const Tar
     return exitDone;
 }
 
+int deleteContainers(const zorvane::ConnectOptions& connect, const Output& output, const Target& target,
+                     const std::vector<std::string>& identifiers) {
+    const std::string what = "delete from " + std::string(zorvane::containerClassName(target.containerClass));
+    auto client = zorvane::Client::connect(connect);
+    if (!client)
+        return output.error(client.error(), what);
+    const auto containers = client->list(target.containerClass, userOf(target), target.transient);
+    if (!containers)
+        return output.error(containers.error(), what);
+    std::vector<zorvane::Client::Deletion> deletions;
+    for (const std::string& identifier : identifiers) {
+        const auto found = std::ranges::find(*containers, identifier, &zorvane::ListedContainer::identifier);
+        if (found == containers->end())
+            return output.error(
+                {.kind = zorvane::Error::Kind::daemon,
+                 .code = codeNotFound,
+                 .message = "there is no container of " + printable(identifier) + "; nothing was deleted"},
+                what);
+        deletions.push_back({.containerClass = target.containerClass,
+                             .user = userOf(target),
+                             .identifier = identifier,
+                             .uuid = found->uuid});
+    }
+    if (const auto staged = client->stageForDelete(deletions); !staged)
+        return output.error(staged.error(), what);
+    nlohmann::json rows = nlohmann::json::array();
+    for (const auto& deletion : deletions) {
+        rows.push_back({{"identifier", deletion.identifier}, {"uuid", zorvane::uuidText(deletion.uuid)}});
+        if (!output.isJson())
+            output.line(printable(deletion.identifier) + " deleted");
+    }
+    if (output.isJson())
+        output.json(rows);
+    return exitDone;
+}
+
 int emptyDeathRow(const zorvane::ConnectOptions& connect, const Output& output) {
     auto client = zorvane::Client::connect(connect);
     if (!client)
@@ -120,7 +141,8 @@ int status(const zorvane::ConnectOptions& connect, const Output& output) {
     }
     if (const auto* map = std::get_if<zorvane::Map>(&answer->content))
         for (const auto& [key, value] : *map)
-            printTree(output, key, value, "");
+            if (key != statusEntitlements && key != statusGroupReferences) // 'entitlements show' and 'why' have them
+                output.tree(key, value);
     return exitDone;
 }
 

@@ -1,0 +1,145 @@
+// SPDX-License-Identifier: Apache-2.0
+// Registering, showing and removing what an identifier is entitled to.
+#include "Commands.h"
+#include "RegisteredEntitlements.h"
+
+#include <cstdio>
+#include <fstream>
+#include <iostream>
+#include <iterator>
+
+namespace zorvanectl {
+
+namespace {
+
+/// nullopt for what entitlements cannot hold.
+std::optional<zorvane::Value> fromJson(const nlohmann::json& json) {
+    zorvane::Value value;
+    if (json.is_boolean()) {
+        value.content = json.get<bool>();
+    } else if (json.is_number_unsigned()) {
+        value.content = json.get<std::uint64_t>();
+    } else if (json.is_number_integer()) {
+        value.content = json.get<std::int64_t>();
+    } else if (json.is_number_float()) {
+        value.content = json.get<double>();
+    } else if (json.is_string()) {
+        value.content = json.get<std::string>();
+    } else if (json.is_array()) {
+        zorvane::List& list = value.content.emplace<zorvane::List>();
+        for (const auto& element : json) {
+            auto converted = fromJson(element);
+            if (!converted)
+                return std::nullopt;
+            list.push_back(std::move(*converted));
+        }
+    } else if (json.is_object()) {
+        zorvane::Map& map = value.content.emplace<zorvane::Map>();
+        for (const auto& [key, element] : json.items()) {
+            auto converted = fromJson(element);
+            if (!converted)
+                return std::nullopt;
+            map.emplace(key, std::move(*converted));
+        }
+    } else {
+        return std::nullopt;
+    }
+    return value;
+}
+
+/// The object in a file; nullopt, said on standard error, when there is none.
+std::optional<zorvane::Map> readFile(const std::string& file) {
+    std::ifstream opened;
+    if (file != "-")
+        opened.open(file);
+    std::istream& input = file == "-" ? std::cin : opened;
+    const std::string text((std::istreambuf_iterator<char>(input)), std::istreambuf_iterator<char>());
+    const bool unreadable = input.bad() || (file != "-" && !opened.is_open());
+    const auto json = nlohmann::json::parse(text, nullptr, false);
+    if (!unreadable && json.is_object())
+        if (auto value = fromJson(json))
+            return std::get<zorvane::Map>(std::move(value->content));
+    std::fprintf(stderr, "zorvanectl: %s %s\n", printable(file).c_str(),
+                 unreadable ? "cannot be read" : "holds no JSON object without null");
+    return std::nullopt;
+}
+
+void addStrings(zorvane::Map& map, const char* key, const std::vector<std::string>& texts) {
+    if (texts.empty())
+        return;
+    zorvane::List list;
+    for (const std::string& text : texts)
+        list.push_back({text});
+    map[key] = {std::move(list)};
+}
+
+int answer(const zorvane::Result<void>& result, const Output& output, const std::string& identifier, const char* verb) {
+    if (!result)
+        return output.error(result.error(), "register " + identifier);
+    if (output.isJson())
+        output.json({{"identifier", identifier}, {verb, true}});
+    else
+        output.line(printable(identifier) + " " + verb);
+    return exitDone;
+}
+
+} // namespace
+
+int setEntitlements(const zorvane::ConnectOptions& connect, const Output& output, const Registration& registration) {
+    zorvane::Map entitlements;
+    if (!registration.file.empty()) {
+        auto read = readFile(registration.file);
+        if (!read)
+            return exitUsage;
+        entitlements = std::move(*read);
+    }
+    addStrings(entitlements, applicationGroupsKey, registration.applicationGroups);
+    addStrings(entitlements, systemGroupsKey, registration.systemGroups);
+    if (registration.systemContainer)
+        entitlements[systemContainerKey] = {true};
+    if (entitlements.empty()) {
+        std::fprintf(stderr,
+                     "zorvanectl: no entitlements given; to remove what is registered, use 'entitlements clear'\n");
+        return exitUsage;
+    }
+    auto client = zorvane::Client::connect(connect);
+    if (!client)
+        return output.error(client.error(), "register " + registration.identifier);
+    return answer(client->processEntitlements({.identifier = registration.identifier,
+                                               .entitlements = std::move(entitlements),
+                                               .parentIdentifier = registration.parent,
+                                               .placeholder = registration.placeholder}),
+                  output, registration.identifier, "registered");
+}
+
+int showEntitlements(const zorvane::ConnectOptions& connect, const Output& output, const std::string& identifier) {
+    const std::string what = "show the entitlements of " + identifier;
+    const auto registered = RegisteredEntitlements::ask(connect);
+    if (!registered)
+        return output.error(registered.error(), what);
+    const zorvane::Map* entitlements = registered->of(identifier);
+    if (output.isJson()) {
+        output.json({{"identifier", identifier},
+                     {"registered", entitlements != nullptr},
+                     {"entitlements", toJson({entitlements ? *entitlements : zorvane::Map()})},
+                     {"children", registered->childrenOf(identifier)}});
+        return exitDone;
+    }
+    output.line(printable(identifier) + (entitlements ? "" : ": nothing is registered"));
+    for (const auto& [key, value] : entitlements ? *entitlements : zorvane::Map())
+        output.tree(key, value, "  ");
+    for (const std::string& child : registered->childrenOf(identifier))
+        output.line("  child: " + printable(child));
+    return exitDone;
+}
+
+int clearEntitlements(const zorvane::ConnectOptions& connect, const Output& output, const std::string& identifier) {
+    auto client = zorvane::Client::connect(connect);
+    if (!client)
+        return output.error(client.error(), "clear the entitlements of " + identifier);
+    return answer(
+        client->processEntitlements({.identifier = identifier, .entitlements = std::nullopt, .parentIdentifier = {}}),
+        output, identifier, "cleared");
+}
+
+} // namespace zorvanectl

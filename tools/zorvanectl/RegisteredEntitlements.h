@@ -1,0 +1,50 @@
+// SPDX-License-Identifier: Apache-2.0
+// What the daemon tells the owner of its root about registered entitlements.
+#pragma once
+
+#include "zorvane/Client.h"
+
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace zorvanectl {
+
+// Keys of the status.
+inline constexpr const char* statusEntitlements = "Entitlements";
+inline constexpr const char* statusGroupReferences = "GroupReferences";
+inline constexpr const char* statusEntitlementsLeftOut = "EntitlementsLeftOut";
+
+// Entitlements that decide about containers.
+inline constexpr const char* applicationGroupsKey = "com.veltra.security.application-groups";
+inline constexpr const char* systemGroupsKey = "com.veltra.security.system-groups";
+inline constexpr const char* systemContainerKey = "com.veltra.security.system-container";
+/// The map's own dictionary of parents to children.
+inline constexpr const char* childrenKey = "com.veltra.Zorvane.ChildPluginBundleIDs";
+
+class RegisteredEntitlements {
+public:
+    /// An error when this program may not see them.
+    [[nodiscard]] static zorvane::Result<RegisteredEntitlements> ask(const zorvane::ConnectOptions& connect);
+
+    /// nullptr when nothing is registered.
+    [[nodiscard]] const zorvane::Map* of(const std::string& identifier) const;
+    [[nodiscard]] bool hasSystemContainer(const std::string& identifier) const;
+    [[nodiscard]] std::vector<std::string> childrenOf(const std::string& identifier) const;
+
+    struct Group {
+        std::string identifier;
+        /// Who lists it, once for each time.
+        std::vector<std::string> holders;
+    };
+    enum class GroupKind { application, system };
+    /// The groups of this kind that an identifier refers to.
+    [[nodiscard]] std::vector<Group> groupsOf(const std::string& identifier, GroupKind kind) const;
+
+private:
+    explicit RegisteredEntitlements(zorvane::Map status) : status_(std::move(status)) {}
+    [[nodiscard]] const zorvane::Map* map(const char* key) const;
+    zorvane::Map status_;
+};
+
+} // namespace zorvanectl
