@@ -34,7 +34,8 @@ Composition::Late::Late(Composition& composition)
                .deathRowQueue = composition.platform_.deathRowQueue,
                .transactions = composition.platform_.transactions,
                .sharedClientConnection = nullptr},
-      dispatcher(composition.log_, composition.users_, services) {
+      dispatcher(composition.log_, composition.users_, services),
+      upcallServer(services, composition.platform_.upcallPort) {
     services.sharedClientConnection = std::make_shared<ZORClientConnection>(
         services, ZORClientConnection::Client{.bundleIdentifier = "com.veltra.zorvaned.internal",
                                               .userId = 0,
@@ -54,6 +55,10 @@ StoreServices& Composition::store() {
 
 Dispatcher& Composition::dispatcher() {
     return late().dispatcher;
+}
+
+UpcallServer& Composition::upcallServer() {
+    return late().upcallServer;
 }
 
 const std::shared_ptr<ZORClientConnection>& Composition::sharedClientConnection() {

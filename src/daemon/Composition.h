@@ -22,6 +22,7 @@
 #include "store/StoreServices.h"
 #include "store/ZORContainerCache.h"
 #include "store/ZORGlobalConfiguration.h"
+#include "upcall/UpcallServer.h"
 
 #include <memory>
 #include <optional>
@@ -44,6 +45,7 @@ public:
     // is open. Not before the log is; the first call is made by the thread that starts the daemon.
     [[nodiscard]] StoreServices& store();
     [[nodiscard]] Dispatcher& dispatcher();
+    [[nodiscard]] UpcallServer& upcallServer();
     /// The daemon's own client.
     [[nodiscard]] const std::shared_ptr<ZORClientConnection>& sharedClientConnection();
     [[nodiscard]] ZOREntitlementMapping& entitlements();
@@ -74,6 +76,7 @@ private:
         ZORWhitelist whitelist;
         StoreServices services;
         Dispatcher dispatcher;
+        UpcallServer upcallServer;
     };
     std::optional<Late> late_;
 };

@@ -105,12 +105,9 @@ bool Daemon::startUpcallServer() {
         log.write(logLevelError, function, "%s: %s", platform.upcallPort.checkInCallName(), errorText(failure));
         return false;
     }
-    const bool serving = platform.upcallPort.serve(platform.runLoop, [&log](const platform::UpcallPacket& packet) {
-        if (log.writes(logLevelDebug))
-            log.write(logLevelDebug, "ZORKernServer", "Upcall of %zu bytes from pid %d is not served by this version",
-                      packet.bytes.size(), packet.senderPid.value_or(-1));
-        return std::vector<std::uint8_t>();
-    });
+    UpcallServer& server = composition_.upcallServer();
+    const bool serving = platform.upcallPort.serve(
+        platform.runLoop, [&server](const platform::UpcallPacket& packet) { return server.answer(packet); });
     if (!serving)
         log.write(logLevelError, function, "%s failed", platform.upcallPort.sourceCallName());
     return serving;

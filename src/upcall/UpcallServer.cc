@@ -1,0 +1,221 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "upcall/UpcallServer.h"
+
+#include "daemon/ZORClientConnection.h"
+#include "daemon/base/UserIdentity.h"
+#include "plist/Value.h"
+#include "store/Names.h"
+#include "store/StoreServices.h"
+
+#include <cerrno>
+#include <new>
+
+namespace zor {
+
+using upcall::ReturnCode;
+
+namespace {
+
+constexpr const char* function = "server_get_process_containers";
+constexpr std::uint32_t replyBlockBytes = 4096;
+constexpr pid_t kernelPid = 0;
+constexpr std::uint32_t rootPersona = 0;
+
+using Groups = std::map<std::string, std::string>;
+
+std::string described(const std::optional<Groups>& groups) {
+    if (!groups)
+        return "(null)";
+    plist::Dictionary dictionary;
+    for (const auto& [identifier, path] : *groups)
+        dictionary.set(identifier, path);
+    const plist::Value value(std::move(dictionary));
+    return plist::describe(&value);
+}
+
+const char* orNull(const std::optional<std::string>& path) {
+    return path ? path->c_str() : "(null)";
+}
+
+/// Looks up one container after the other, making what is missing, and keeps whether all could be had.
+class Lookups {
+public:
+    Lookups(const Log& log, ZORClientConnection& client) : log_(log), client_(client) {}
+
+    /// `failure` is what the line about a failure begins with.
+    std::optional<std::string> pathOf(std::uint32_t userId, const std::string& identifier,
+                                      ContainerClass containerClass, const char* failure) {
+        auto found = client_.createOrLookupContainerForUser(
+            userId, &identifier, containerClass,
+            {.createIfNecessary = true, .transient = false, .useLocking = UseLocking::yes});
+        if (found)
+            return std::move(found->path);
+        log_.write(logLevelError, function, "%s Failed with error: %llu", failure,
+                   static_cast<unsigned long long>(found.error().replyCode()));
+        success_ = false;
+        return std::nullopt;
+    }
+
+    Groups pathsOf(std::uint32_t userId, const std::vector<std::string>& identifiers, ContainerClass containerClass,
+                   const char* failure) {
+        Groups groups;
+        for (const std::string& identifier : identifiers)
+            if (auto path = pathOf(userId, identifier, containerClass, failure))
+                groups.insert_or_assign(identifier, std::move(*path));
+        return groups;
+    }
+
+    [[nodiscard]] bool success() const { return success_; }
+
+private:
+    const Log& log_;
+    ZORClientConnection& client_;
+    bool success_ = true;
+};
+
+} // namespace
+
+UpcallServer::UpcallServer(StoreServices& services, const platform::UpcallPort& port)
+    : services_(services), log_(services.log), port_(port) {}
+
+std::vector<std::uint8_t> UpcallServer::answer(const platform::UpcallPacket& packet) {
+    std::vector<std::uint8_t> reply;
+    try {
+        std::optional<Log::ClientScope> provoked;
+        if (packet.senderUserId)
+            provoked.emplace(*packet.senderUserId);
+        demux_server(packet, reply);
+    } catch (const std::exception&) {
+        // Not even the line or the answer that says so can be made: the packet is dropped.
+        reply.clear();
+    }
+    return reply;
+}
+
+void UpcallServer::demux_server(const platform::UpcallPacket& request, std::vector<std::uint8_t>& reply) {
+    const std::optional<std::uint32_t> messageId = upcall::messageIdOf(request.bytes);
+    if (!messageId)
+        return;
+    ZOR_LOG(log_, logLevelDebug, "in demux_server(); request->msgh_id: %d", static_cast<std::int32_t>(*messageId));
+    const auto buffer = upcall::decodeRequest(request.bytes);
+    if (!buffer || !request.senderPid) {
+        reply = upcall::encodeErrorReply(*messageId, buffer ? ReturnCode::senderUnknown : buffer.error());
+        return;
+    }
+    ZOR_LOG(log_, logLevelDebug, "handling incomming request for container_manager server");
+    std::vector<std::uint8_t> replyBuffer;
+    const auto outcome = services_.boundary.run({function, __LINE__}, [&]() -> Result<ReturnCode> {
+        return server_get_process_containers(*buffer, *request.senderPid, replyBuffer);
+    });
+    const ReturnCode code = outcome ? *outcome : ReturnCode::noBuffer;
+    ZOR_LOG(log_, logLevelDebug, "container_manager server returns: %d", static_cast<int>(code));
+    reply = code == ReturnCode::success ? upcall::encodeReply(*messageId, replyBuffer)
+                                        : upcall::encodeErrorReply(*messageId, code);
+}
+
+ReturnCode UpcallServer::server_get_process_containers(upcall::Bytes request, pid_t senderPid,
+                                                       std::vector<std::uint8_t>& reply) {
+    if (senderPid != kernelPid)
+        return ReturnCode::refused;
+    ProcessContainersRequest wanted;
+    if (const ReturnCode code = readRequest(request, wanted); code != ReturnCode::success)
+        return code;
+    const PackbuffPointer packbuff(sb_packbuff_new(replyBlockBytes));
+    if (!packbuff)
+        return ReturnCode::noBuffer;
+    ProcessContainers containers;
+    const bool success = lookUp(wanted, containers);
+    if (success)
+        containers.homeDirectory = homeDirectoryOf(wanted.personaId);
+    else
+        containers = {};
+    if (log_.writes(logLevelDebug))
+        logContainers(wanted, containers);
+    packProcessContainersReply(log_, *packbuff, containers, success);
+    copyReply(*packbuff, reply);
+    return ReturnCode::success;
+}
+
+ReturnCode UpcallServer::readRequest(upcall::Bytes bytes, ProcessContainersRequest& request) const {
+    std::vector<std::uint8_t> buffer(bytes.begin(), bytes.end());
+    if (log_.writes(logLevelDebug))
+        log_.write(logLevelDebug, function, "request size: %u (%p)", static_cast<unsigned>(buffer.size()),
+                   static_cast<const void*>(buffer.data()));
+    const PackbuffPointer reader(sb_packbuff_init_with_buffer(buffer.data(), buffer.size(), true, packbuffDeallocNone));
+    if (!reader) {
+        log_.write(logLevelError, function, "sb_packbuff_init() of request data fails");
+        return ReturnCode::noBuffer;
+    }
+    if (log_.writes(logLevelDebug))
+        log_.write(logLevelDebug, function, "request packbuff byte address:%p",
+                   static_cast<const void*>(sb_packbuff_get_bytes(reader.get())));
+    return readProcessContainersRequest(log_, *reader, request);
+}
+
+bool UpcallServer::lookUp(const ProcessContainersRequest& request, ProcessContainers& found) {
+    ZORClientConnection& client = *services_.sharedClientConnection;
+    client.setAllowOtherIdLookup(true);
+    client.setAllowGroupIdLookup(true);
+    Lookups lookups(log_, client);
+    if (const std::string* identifier = request.dataContainerIdentifier())
+        found.dataContainer = lookups.pathOf(request.personaId, *identifier, ContainerClass::dataApplication,
+                                             "createOrLookupContainerForUser:");
+    if (request.systemContainerIdentifier)
+        found.systemContainer =
+            lookups.pathOf(systemOwnerUserId, *request.systemContainerIdentifier, ContainerClass::dataSystem,
+                           "createOrLookupContainerForUser:(system container)");
+    found.appGroups = lookups.pathsOf(request.personaId, request.appGroupIdentifiers, ContainerClass::sharedAppGroup,
+                                      "createOrLookupGroupContainersForUser:");
+    found.systemGroups =
+        lookups.pathsOf(systemOwnerUserId, request.systemGroupIdentifiers, ContainerClass::sharedSystemGroup,
+                        "createOrLookupContainerForUser:(system group container)");
+    if (found.dataContainer)
+        found.temporaryDirectory =
+            FileURL::directory(*found.dataContainer).appendingDirectory(names::containerTemporary).path();
+    return lookups.success();
+}
+
+std::optional<std::string> UpcallServer::homeDirectoryOf(std::uint32_t personaId) {
+    if (personaId == rootPersona)
+        return services_.fileManager.resolver().root().path(names::rootHome);
+    const ZORPerUserConfiguration* user = services_.configuration.getPerUserConfigurationForUserId(personaId);
+    if (!user || !user->userHomeDirectory())
+        return std::nullopt;
+    return user->userHomeDirectory()->path();
+}
+
+void UpcallServer::logContainers(const ProcessContainersRequest& request, const ProcessContainers& containers) const {
+    const auto line = [&](const char* name, const char* value) {
+        log_.write(logLevelDebug, function, "%s: %s", name, value);
+    };
+    log_.write(logLevelDebug, function, "UPCALL-Containers for %s(%u):", ZOR_SHOWN(request.dataContainerIdentifier()),
+               request.personaId);
+    line("dataContainerURL", orNull(containers.dataContainer));
+    line("tempContainerURL", orNull(containers.temporaryDirectory));
+    line("homeDirURL", orNull(containers.homeDirectory));
+    line("groupURLs", described(containers.appGroups).c_str());
+    line("systemContainerURL", orNull(containers.systemContainer));
+    line("systemGroupURLs", described(containers.systemGroups).c_str());
+}
+
+void UpcallServer::copyReply(const sb_packbuff& packbuff, std::vector<std::uint8_t>& reply) const {
+    const std::uint8_t* const bytes = sb_packbuff_get_bytes(&packbuff);
+    const std::size_t size = sb_packbuff_get_size(&packbuff);
+    int error = upcall::ReplyOffset::buffer + size > port_.replyBytesMax() ? EMSGSIZE : 0;
+    if (error == 0) {
+        try {
+            reply.assign(bytes, bytes + size);
+        } catch (const std::bad_alloc&) {
+            error = ENOMEM;
+        }
+    }
+    if (error != 0)
+        log_.write(logLevelError, function, "copyReply(%p, %lu) fails: %d", static_cast<const void*>(bytes), size,
+                   error);
+    else if (log_.writes(logLevelDebug))
+        log_.write(logLevelDebug, function, "packbuff bytes: %p, reply bytes: %p, reply size: %u",
+                   static_cast<const void*>(bytes), static_cast<const void*>(reply.data()),
+                   static_cast<unsigned>(size));
+}
+
+} // namespace zor

@@ -1,0 +1,386 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "upcall/packbuff/Packbuff.h"
+
+#include "upcall/PackbuffWorld.h"
+
+#include <functional>
+#include <gtest/gtest.h>
+#include <limits>
+#include <regex>
+#include <sys/resource.h>
+#include <sys/wait.h>
+
+namespace zor::test {
+namespace {
+
+constexpr std::uint32_t lengthMax = std::numeric_limits<std::uint32_t>::max();
+
+std::span<const std::uint8_t> contentOf(const sb_packbuff& packbuff) {
+    return {sb_packbuff_get_bytes(&packbuff), sb_packbuff_get_size(&packbuff)};
+}
+
+PackbuffPointer readerOf(std::uint8_t* bytes, std::size_t size) {
+    return PackbuffPointer(sb_packbuff_init_with_buffer(bytes, size, true, packbuffDeallocNone));
+}
+
+// Goal: what is written has exactly these bytes, from an empty buffer on. Method: each row writes into a buffer full of
+// other bytes, so that padding that is left as it was shows.
+TEST(Packbuff, WritesByteForByte) {
+    const std::string end = "00 00 00 00 00 00 00 00";
+    struct Row {
+        const char* name;
+        std::function<int(sb_packbuff*)> write;
+        std::string bytes; // before the end item
+    };
+    const Row rows[] = {
+        {"nothing", [](sb_packbuff*) { return 0; }, ""},
+        {"uint32", [](sb_packbuff* p) { return sb_packbuff_pack_uint32(p, 3, 501); }, "01 00 03 00 f5 01 00 00"},
+        {"largest", [](sb_packbuff* p) { return sb_packbuff_pack_uint32(p, 0xFFFF, lengthMax); },
+         "01 00 ff ff ff ff ff ff"},
+        {"string", [](sb_packbuff* p) { return sb_packbuff_pack_string(p, 4, "ab", 2); },
+         "02 00 04 00 03 00 00 00  61 62 00 00 00 00 00 00"},
+        {"empty string", [](sb_packbuff* p) { return sb_packbuff_pack_string(p, 1, "", 0); },
+         "02 00 01 00 01 00 00 00  00 00 00 00 00 00 00 00"},
+        {"string without padding", [](sb_packbuff* p) { return sb_packbuff_pack_string(p, 1, "abcdefg", 7); },
+         "02 00 01 00 08 00 00 00  61 62 63 64 65 66 67 00"},
+        {"bytes",
+         [](sb_packbuff* p) { return sb_packbuff_pack_bytes(p, 9, "\x01\x02\x03\x04\x05\x06\x07\x08\x09", 9); },
+         "03 00 09 00 09 00 00 00  01 02 03 04 05 06 07 08  09 00 00 00 00 00 00 00"},
+        {"no bytes", [](sb_packbuff* p) { return sb_packbuff_pack_bytes(p, 9, nullptr, 0); },
+         "03 00 09 00 00 00 00 00"},
+        {"pair", [](sb_packbuff* p) { return sb_packbuff_pack_key_with_string_value(p, 3, "k", 4, "value"); },
+         "02 00 03 00 02 00 00 00  6b 00 00 00 00 00 00 00  02 00 04 00 06 00 00 00  76 61 6c 75 65 00 00 00"},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.name);
+        const ByteVector expected = fromHex(row.bytes + end);
+        ByteVector memory(expected.size(), 0xEE);
+        const PackbuffPointer fixed(
+            sb_packbuff_init_with_buffer(memory.data(), memory.size(), false, packbuffDeallocNone));
+        const PackbuffPointer growing(sb_packbuff_new(8));
+        for (sb_packbuff* packbuff : {fixed.get(), growing.get()}) {
+            ASSERT_TRUE(packbuff);
+            EXPECT_EQ(toHex(contentOf(*packbuff)), toHex(fromHex(end)));
+            EXPECT_EQ(row.write(packbuff), packbuffSuccess);
+            EXPECT_EQ(toHex(contentOf(*packbuff)), toHex(expected));
+            EXPECT_EQ(packbuff->bytes_remaining, packbuff->bytes_allocated - packbuff->bytes_used);
+            EXPECT_EQ(packbuff->item, packbuff->item_buffer + expected.size() - packbuffHeaderBytes);
+            const std::string before = toHex(contentOf(*packbuff));
+            // One that is full says so and stays as it was.
+            if (packbuff == fixed.get()) {
+                EXPECT_EQ(sb_packbuff_pack_uint32(packbuff, 1, 1), packbuffNotSupported);
+                EXPECT_EQ(toHex(contentOf(*packbuff)), before);
+            }
+        }
+    }
+}
+
+// Goal: a writer grows by its step and by what is needed, no more. Method: sizes after each write, against a table.
+TEST(Packbuff, GrowsByItsStep) {
+    struct Row {
+        std::uint32_t blockSize;
+        std::vector<std::uint32_t> lengths; // of bytes items
+        std::vector<std::uint32_t> allocated;
+    };
+    const std::string data(1000, 'x');
+    const Row rows[] = {
+        {0, {}, {256}},
+        {7, {}, {256}},
+        {8, {0, 0}, {8, 16, 24}},
+        {12, {0, 0}, {12, 24, 24}},
+        {256, {240, 0, 1000}, {256, 256, 512, 512 + 256 + 1008}},
+        {256, {241}, {256, 256 + 256 + 0}},
+        {16, {100}, {16, 16 + 16 + 112}},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.blockSize);
+        const PackbuffPointer packbuff(sb_packbuff_new(row.blockSize));
+        ASSERT_TRUE(packbuff);
+        std::vector<std::uint32_t> allocated{packbuff->bytes_allocated};
+        std::uint32_t used = 8;
+        for (const std::uint32_t length : row.lengths) {
+            EXPECT_EQ(sb_packbuff_pack_bytes(packbuff.get(), 1, data.data(), length), packbuffSuccess);
+            used += 8 + (length + 7) / 8 * 8;
+            EXPECT_EQ(packbuff->bytes_used, used);
+            EXPECT_EQ(packbuff->bytes_remaining, packbuff->bytes_allocated - used);
+            allocated.push_back(packbuff->bytes_allocated);
+        }
+        EXPECT_EQ(allocated, row.allocated);
+    }
+}
+
+// Goal: what cannot be written is refused with its code and changes nothing. Method: a table over one writer.
+TEST(Packbuff, RefusesWhatItCannotWrite) {
+    struct Row {
+        const char* name;
+        std::function<int(sb_packbuff*)> write;
+        int error;
+    };
+    const Row rows[] = {
+        {"string of the longest length", [](sb_packbuff* p) { return sb_packbuff_pack_string(p, 1, "a", lengthMax); },
+         packbuffInvalidArgument},
+        {"no NUL there", [](sb_packbuff* p) { return sb_packbuff_pack_string(p, 1, "abc", 2); },
+         packbuffInvalidArgument},
+        {"over 32 bits with its header", [](sb_packbuff* p) { return sb_packbuff_pack_bytes(p, 1, "", lengthMax - 7); },
+         packbuffOutOfRange},
+        {"over 32 bits with its padding", [](sb_packbuff* p) { return sb_packbuff_pack_bytes(p, 1, "", lengthMax); },
+         packbuffOutOfRange},
+        {"over 32 bits with what is there",
+         [](sb_packbuff* p) { return sb_packbuff_pack_bytes(p, 1, "", lengthMax - 15); }, packbuffOutOfRange},
+    };
+    const PackbuffPointer packbuff(sb_packbuff_new(64));
+    ASSERT_EQ(sb_packbuff_pack_string(packbuff.get(), 1, "first", 5), packbuffSuccess);
+    const std::string before = toHex(contentOf(*packbuff));
+    const std::uint8_t* const cursor = packbuff->item;
+    for (const Row& row : rows) {
+        EXPECT_EQ(row.write(packbuff.get()), row.error) << row.name;
+        EXPECT_EQ(toHex(contentOf(*packbuff)), before) << row.name;
+        EXPECT_EQ(packbuff->item, cursor) << row.name;
+    }
+    ByteVector memory(64);
+    EXPECT_EQ(sb_packbuff_init_with_buffer(memory.data(), 7, false, packbuffDeallocNone), nullptr);
+    EXPECT_EQ(sb_packbuff_init_with_buffer(memory.data(), 0, true, packbuffDeallocNone), nullptr);
+    EXPECT_EQ(sb_packbuff_init_with_buffer(nullptr, 64, true, packbuffDeallocNone), nullptr);
+    EXPECT_EQ(sb_packbuff_init_with_buffer(memory.data(), std::size_t{lengthMax} + 1, true, packbuffDeallocNone),
+              nullptr);
+}
+
+// Goal: a size that was set to anything makes no later write leave the buffer. Method: every size over a buffer that
+// ends where the memory does, and writes until one is refused.
+TEST(Packbuff, AnySizeThatIsSetStaysInside) {
+    const EdgeOfMemory memory(ByteVector(64));
+    for (std::uint32_t size = 0; size < 80; ++size) {
+        const PackbuffPointer packbuff(sb_packbuff_init_with_buffer(memory.data(), 64, false, packbuffDeallocNone));
+        ASSERT_EQ(sb_packbuff_pack_string(packbuff.get(), 1, "0123456789", 10), packbuffSuccess);
+        sb_packbuff_set_size(packbuff.get(), size);
+        EXPECT_EQ(sb_packbuff_get_size(packbuff.get()), std::min(size, 64U));
+        EXPECT_EQ(packbuff->bytes_remaining, 64U - std::min(size, 64U));
+        int written = 0;
+        while (sb_packbuff_pack_uint32(packbuff.get(), 1, 1) == packbuffSuccess)
+            ASSERT_LT(++written, 10);
+        const PackbuffPointer growing(sb_packbuff_new(16));
+        sb_packbuff_set_size(growing.get(), size);
+        (void)sb_packbuff_pack_string(growing.get(), 1, "0123456789", 10);
+    }
+}
+
+std::string readAll(sb_packbuff* packbuff) {
+    std::string text;
+    std::uint16_t valueType = 0;
+    while (sb_packbuff_get_item_value_type(packbuff, &valueType) != 0) {
+        int error = 0;
+        std::uint32_t length = 0;
+        text += std::to_string(valueType) + "=";
+        const std::uint8_t* const before = packbuff->item;
+        const std::uint32_t number = sb_packbuff_unpack_uint32(packbuff, &error);
+        if (error == packbuffSuccess) {
+            text += std::to_string(number) + " ";
+            continue;
+        }
+        EXPECT_EQ(packbuff->item, before);
+        if (error != packbuffInvalidArgument)
+            return text + "error " + std::to_string(error);
+        if (const char* string = sb_packbuff_unpack_string(packbuff, &length, &error)) {
+            text += "'" + std::string(string, length) + "' ";
+            continue;
+        }
+        if (error == packbuffInvalidArgument && packbuff->item == before) {
+            const std::uint8_t* const data = sb_packbuff_unpack_bytes(packbuff, &length, &error);
+            if (error == packbuffSuccess) {
+                text +=
+                    "<" + std::to_string(length) + (length > 0 ? " " + std::to_string(data[length - 1]) : "") + "> ";
+                continue;
+            }
+        }
+        return text + "error " + std::to_string(error);
+    }
+    return text + (sb_packbuff_is_at_end(packbuff) ? "end" : "cut");
+}
+
+// Goal: a reader tells what is there, in order, and where it is broken. Method: a table of bytes.
+TEST(Packbuff, ReadsWhatIsThere) {
+    const std::string end = "00 00 00 00 00 00 00 00 ";
+    const std::string ab = "02 00 04 00 03 00 00 00 61 62 00 00 00 00 00 00 ";
+    struct Row {
+        std::string bytes;
+        std::string read;
+    };
+    const Row rows[] = {
+        {end, "end"},
+        {"01 00 03 00 f5 01 00 00 " + ab + "03 00 05 00 01 00 00 00 07 00 00 00 00 00 00 00 " + end,
+         "3=501 4='ab' 5=<1 7> end"},
+        {ab + "00 00 ff ff ff ff ff ff", "4='ab' end"},
+        {"02 00 01 00 05 00 00 00 61 00 62 00 00 00 00 00" + end, std::string("1='a\0b\0' end", 12)},
+        {"02 00 01 00 00 00 00 00" + end, "1=error 22"},
+        {"02 00 01 00 02 00 00 00 61 62 00 00 00 00 00 00" + end, "1=error 22"},
+        {"04 00 01 00 02 00 00 00" + end, "1=error 22"},
+        {"ff ff 01 00 02 00 00 00" + end, "1=error 22"},
+        {ab, "4=error 34"},
+        {"01 00 01 00 01 00 00 00", "1=error 34"},
+        {"02 00 01 00 08 00 00 00" + end, "1=error 34"},
+        {"02 00 01 00 09 00 00 00" + end + end, "1=error 34"},
+        {"02 00 01 00 ff ff ff ff" + end, "1=error 34"},
+        {"02 00 01 00 f8 ff ff ff" + end, "1=error 34"},
+        {"03 00 01 00 f9 ff ff ff" + end, "1=error 34"},
+        {ab + "02 00 04 00 03 00 00", "4='ab' cut"},
+        {ab + "00", "4='ab' cut"},
+        {"00", "cut"},
+        {"02 00 04 00 03 00 00", "cut"},
+    };
+    for (const Row& row : rows) {
+        const ByteVector bytes = fromHex(row.bytes);
+        const EdgeOfMemory memory(bytes); // of any alignment
+        const PackbuffPointer reader = readerOf(memory.data(), bytes.size());
+        ASSERT_TRUE(reader);
+        EXPECT_EQ(readAll(reader.get()), row.read) << row.bytes;
+        EXPECT_EQ(toHex({memory.data(), bytes.size()}), toHex(bytes)) << "a reader wrote";
+    }
+    ByteVector pair = fromHex("02 00 03 00 02 00 00 00 6b 00 00 00 00 00 00 00" + ab + end);
+    const char* key = nullptr;
+    const char* value = nullptr;
+    std::uint16_t valueType = 99;
+    std::uint32_t length = 0;
+    PackbuffPointer reader = readerOf(pair.data(), pair.size());
+    EXPECT_EQ(sb_packbuff_unpack_key_with_string_value(reader.get(), &key, &valueType, &value, &length), 0);
+    EXPECT_EQ(std::string(key) + "/" + std::string(value, length) + "/" + std::to_string(valueType), "k/ab/4");
+    // A key without a value: the type is not told, the error is the value's.
+    valueType = 99;
+    reader = readerOf(pair.data() + 16, pair.size() - 16);
+    EXPECT_EQ(sb_packbuff_unpack_key_with_string_value(reader.get(), &key, &valueType, &value, &length),
+              packbuffInvalidArgument);
+    EXPECT_EQ(valueType, 99);
+}
+
+std::string printed(const sb_packbuff* packbuff) {
+    char* text = nullptr;
+    std::size_t size = 0;
+    std::FILE* const stream = ::open_memstream(&text, &size);
+    sb_packbuff_print(packbuff, stream);
+    std::fclose(stream);
+    const std::string copy(text, size);
+    std::free(text);
+    return copy;
+}
+
+// Goal: no bytes make a reader or the dump leave the buffer or run for ever. Method: a whole request at the end of the
+// memory, cut at every length, and with each byte set to values that matter.
+TEST(Packbuff, StaysInsideDamagedBytes) {
+    const ByteVector whole = golden("request.hex");
+    const std::span items = std::span(whole).subspan(24);
+    const auto drive = [](std::span<const std::uint8_t> bytes) {
+        const EdgeOfMemory memory(bytes);
+        const PackbuffPointer reader = readerOf(memory.data(), bytes.size());
+        if (!reader)
+            return;
+        (void)printed(reader.get());
+        (void)readAll(reader.get());
+        (void)printed(reader.get());
+        EXPECT_LE(reader->item, memory.data() + bytes.size());
+    };
+    for (std::size_t size = 0; size <= items.size(); ++size)
+        drive(items.first(size));
+    for (std::size_t at = 0; at < items.size(); ++at)
+        for (const int value : {0, 1, 2, 3, 4, 7, 8, 127, 128, 248, 255}) {
+            ByteVector damaged(items.begin(), items.end());
+            damaged[at] = static_cast<std::uint8_t>(value);
+            drive(damaged);
+        }
+}
+
+// Goal: the dump has these words. Method: whole dumps, addresses taken out.
+TEST(Packbuff, PrintsItsItems) {
+    const auto withoutAddresses = [](const std::string& text) {
+        return std::regex_replace(text, std::regex("0x[0-9a-f]+|\\(nil\\)"), "ADDRESS");
+    };
+    const std::string head = "packbuff: ADDRESS\n  block_size:      %B\n  dealloc_type:    %D\n  bytes_allocated: %A\n"
+                             "  bytes_used:      %U\n  bytes_remaining: %R\n  item_buffer ADDRESS, item: ADDRESS\n\n";
+    const auto headWith = [&](const std::vector<std::pair<std::string, std::string>>& values) {
+        std::string text = head;
+        for (const auto& [key, value] : values)
+            text.replace(text.find(key), key.size(), value);
+        return text;
+    };
+    const PackbuffPointer packbuff(sb_packbuff_new(64));
+    sb_packbuff_pack_uint32(packbuff.get(), 3, 501);
+    sb_packbuff_pack_string(packbuff.get(), 4, "ab", 2);
+    sb_packbuff_pack_bytes(packbuff.get(), 5, "xyz", 3);
+    EXPECT_EQ(withoutAddresses(printed(packbuff.get())),
+              headWith({{"%B", "64"}, {"%D", "free()"}, {"%A", "64"}, {"%U", "48"}, {"%R", "16"}}) +
+                  "   0:ADDRESS -- value type 3 --inline value: 501\n"
+                  "   1:ADDRESS -- value type 4 --string (ADDRESS, 5 pad bytes, size: 3): \n     `ab'\n"
+                  "   2:ADDRESS -- value type 5 --bytes (ADDRESS, 5 pad bytes, size: 3)\n"
+                  "*  3: ADDRESS -- END\n");
+    ByteVector bytes = fromHex("09 00 01 00 08 00 00 00  02 00 01 00 20 00 00 00  61 62 63 64 65 66 67 68");
+    for (const auto& [type, name] : {std::pair{packbuffDeallocNone, "None"}, {PackbuffDealloc(7), "<Unknown>"}}) {
+        const PackbuffPointer reader(sb_packbuff_init_with_buffer(bytes.data(), bytes.size(), true, type));
+        EXPECT_EQ(withoutAddresses(printed(reader.get())),
+                  headWith({{"%B", "0"}, {"%D", name}, {"%A", "24"}, {"%U", "24"}, {"%R", "0"}}) +
+                      "*  0:ADDRESS -- value type 1 --*Unknown item type* 9\n"
+                      "   1:ADDRESS -- value type 1 --string (ADDRESS, 0 pad bytes, size: 32): \n     `abcdefgh'\n"
+                      ">> item pointer exceeds end of buffer. <<");
+    }
+}
+
+// Goal: each kind of buffer is released once, as it was got. Method: pages that are looked for afterwards, pages that
+// cannot be released, a heap buffer (whose leak or double release the sanitizers see), one that stays the caller's.
+TEST(Packbuff, ReleasesItsBuffer) {
+    const auto pageBytes = static_cast<std::size_t>(::getpagesize());
+    void* const pages = ::mmap(nullptr, pageBytes, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+    ASSERT_NE(pages, MAP_FAILED);
+    sb_packbuff* packbuff = sb_packbuff_init_with_buffer(pages, pageBytes, false, packbuffDeallocPages);
+    EXPECT_NE(printed(packbuff).find("dealloc_type:    munmap()\n"), std::string::npos);
+    testing::internal::CaptureStdout();
+    sb_packbuff_free(packbuff);
+    EXPECT_EQ(testing::internal::GetCapturedStdout(), "");
+    unsigned char resident = 0;
+    EXPECT_EQ(::mincore(pages, pageBytes, &resident), -1);
+
+    alignas(8) std::uint8_t own[32] = {};
+    testing::internal::CaptureStdout();
+    sb_packbuff_free(sb_packbuff_init_with_buffer(own + 8, 16, true, packbuffDeallocPages));
+    char expected[64];
+    std::snprintf(expected, sizeof expected, "failed: munmap(%p, 16)\n", static_cast<void*>(own + 8));
+    EXPECT_EQ(testing::internal::GetCapturedStdout(), expected);
+
+    sb_packbuff_free(sb_packbuff_init_with_buffer(std::malloc(16), 16, false, packbuffDeallocFree));
+    sb_packbuff_free(sb_packbuff_init_with_buffer(own, 16, false, packbuffDeallocNone));
+    sb_packbuff_free(nullptr);
+}
+
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__) || defined(__has_feature)
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__) || __has_feature(address_sanitizer) ||               \
+    __has_feature(thread_sanitizer)
+#define ZOR_MEMORY_IS_NOT_LIMITED
+#endif
+#endif
+
+// Goal: without memory the error is told, the buffer is gone, and the handle does no harm until it is freed. Method: a
+// process of its own with a limit on its memory.
+TEST(Packbuff, RunsOutOfMemory) {
+#ifdef ZOR_MEMORY_IS_NOT_LIMITED
+    GTEST_SKIP() << "skipped: sanitizers do not run with a limit on memory";
+#endif
+    const pid_t child = ::fork();
+    if (child == 0) {
+        const PackbuffPointer packbuff(sb_packbuff_new(std::uint32_t{1} << 30));
+        const rlimit limit{.rlim_cur = std::uint64_t{3} << 29, .rlim_max = std::uint64_t{3} << 29};
+        bool holds = packbuff && ::setrlimit(RLIMIT_AS, &limit) == 0;
+        const std::string large(std::size_t{1} << 20, 'x');
+        packbuff->bytes_remaining = 0; // full, without touching a gigabyte
+        holds = holds && sb_packbuff_pack_string(packbuff.get(), 1, large.c_str(), 1U << 20) == packbuffOutOfMemory;
+        holds = holds && sb_packbuff_get_bytes(packbuff.get()) == nullptr && sb_packbuff_get_size(packbuff.get()) == 0;
+        holds = holds && sb_packbuff_pack_uint32(packbuff.get(), 1, 1) == packbuffNotSupported;
+        std::uint16_t valueType = 0;
+        holds = holds && sb_packbuff_get_item_value_type(packbuff.get(), &valueType) == 0;
+        int error = 0;
+        (void)sb_packbuff_unpack_uint32(packbuff.get(), &error);
+        holds = holds && error == packbuffOutOfRange && sb_packbuff_new(1U << 31) == nullptr;
+        ::_exit(holds ? 0 : 1);
+    }
+    int status = 0;
+    ASSERT_EQ(::waitpid(child, &status, 0), child);
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+}
+
+} // namespace
+} // namespace zor::test

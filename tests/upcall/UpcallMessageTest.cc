@@ -1,0 +1,121 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "upcall/ProcessContainersReply.h"
+#include "upcall/UpcallWorld.h"
+
+#include <gtest/gtest.h>
+
+namespace zor::test {
+namespace {
+
+using namespace upcall;
+
+ProcessContainers goldenContainers() {
+    const std::string data = "/private/var/mobile/Containers/Data/Application/9985179A";
+    return {.homeDirectory = "/private/var/mobile",
+            .dataContainer = data,
+            .temporaryDirectory = data + "/tmp",
+            .appGroups = {{{"group.a", "/private/var/mobile/Containers/Shared/AppGroup/0B"}}},
+            .systemContainer = std::nullopt,
+            .systemGroups = {{{"sg", "/private/var/containers/Shared/SystemGroup/7F"}}}};
+}
+
+// Goal: both sides of the upcall write, and read, exactly the bytes of the golden packets. Method: each golden file
+// made by the side that sends it, and read by the side that gets it.
+TEST(UpcallMessage, IsTheGoldenOne) {
+    const ByteVector request = golden("request.hex");
+    Items items;
+    items.string(CM_KERN_REQUEST_CONTAINER_ID, "com.example.app").number(CM_KERN_REQUEST_PERSONA_ID, 501);
+    items.string(CM_KERN_REQUEST_APP_GROUP_ID, "group.a").string(CM_KERN_REQUEST_SYSTEM_GROUP_CONTAINER_ID, "sg");
+    EXPECT_EQ(toHex(items.packet()), toHex(request));
+    const auto buffer = decodeRequest(request);
+    ASSERT_TRUE(buffer);
+    EXPECT_EQ(toHex(*buffer), toHex(items.buffer()));
+
+    support::RecordingLog lines(logLevelNotice);
+    const Log log(lines);
+    const PackbuffPointer packbuff(sb_packbuff_new(4096));
+    packProcessContainersReply(log, *packbuff, goldenContainers(), true);
+    const std::span packed(sb_packbuff_get_bytes(packbuff.get()), sb_packbuff_get_size(packbuff.get()));
+    const ByteVector reply = golden("reply.hex");
+    EXPECT_EQ(toHex(encodeReply(processContainersMessageId, packed)), toHex(reply));
+    const auto read = decodeReply(reply);
+    ASSERT_TRUE(read);
+    EXPECT_EQ(read->returnCode, ReturnCode::success);
+    EXPECT_EQ(toHex(read->buffer), toHex(packed));
+
+    const ByteVector refusal = golden("refusal.hex");
+    EXPECT_EQ(toHex(encodeErrorReply(processContainersMessageId, ReturnCode::refused)), toHex(refusal));
+    const auto refused = decodeReply(refusal);
+    ASSERT_TRUE(refused);
+    EXPECT_EQ(refused->returnCode, ReturnCode::refused);
+    EXPECT_TRUE(refused->buffer.empty());
+}
+
+// Goal: a packet that is not quite a reply is none. Method: golden replies cut everywhere, longer by a byte, and with
+// each field of their headers changed.
+TEST(UpcallMessage, TakesOnlyARepliesForm) {
+    for (const char* name : {"reply.hex", "refusal.hex"}) {
+        const ByteVector reply = golden(name);
+        for (std::size_t size = 0; size < reply.size(); ++size)
+            EXPECT_FALSE(decodeReply(std::span(reply).first(size))) << name << size;
+        ByteVector longer = reply;
+        longer.push_back(0);
+        EXPECT_FALSE(decodeReply(longer)) << name;
+        for (const std::size_t field :
+             {ReplyOffset::totalBytes, ReplyOffset::messageId, ReplyOffset::descriptorCount, ReplyOffset::byteCount}) {
+            ByteVector damaged = reply;
+            damaged[field] ^= 1;
+            EXPECT_FALSE(decodeReply(damaged)) << name << field;
+        }
+    }
+}
+
+// Goal: what does not fit is said in these words, the status tells it, and nothing comes after it. Method: the golden
+// containers packed into buffers of every size that cannot grow.
+TEST(UpcallMessage, AReplyThatDoesNotFitSaysSo) {
+    const ProcessContainers containers = goldenContainers();
+    const auto lineFor = [&](std::size_t packed) -> std::string {
+        switch (packed) {
+        case 0:
+            return "sb_packbuff_pack_string() fails: 45; type: 100, path: " + *containers.homeDirectory;
+        case 1:
+            return "sb_packbuff_pack_string() fails: 45; type: 1, path: " + *containers.dataContainer;
+        case 2:
+            return "sb_packbuff_pack_string() fails: 45; type: 2, path: " + *containers.temporaryDirectory;
+        case 3:
+        case 4:
+            return "sb_packbuff_pack_key_with_string_value() fails: 45; group ID: group.a, group container: " +
+                   containers.appGroups->at("group.a");
+        default:
+            return "sb_packbuff_pack_key_with_string_value() fails: 45; group ID: sg, system group container: " +
+                   containers.systemGroups->at("sg");
+        }
+    };
+    support::RecordingLog lines(logLevelNotice);
+    const Log log(lines);
+    const std::size_t whole = golden("reply.hex").size() - ReplyOffset::buffer;
+    for (std::size_t size = 8; size <= whole; ++size) {
+        SCOPED_TRACE(size);
+        ByteVector memory(size);
+        const PackbuffPointer packbuff(sb_packbuff_init_with_buffer(memory.data(), size, false, packbuffDeallocNone));
+        packProcessContainersReply(log, *packbuff, containers, true);
+        const std::span packed(sb_packbuff_get_bytes(packbuff.get()), sb_packbuff_get_size(packbuff.get()));
+        UpcallReply reply = replyIn(encodeReply(processContainersMessageId, packed));
+        std::vector<std::string> said = lines.take(logLevelError, "server_get_process_containers");
+        const bool hasStatus = !reply.items.empty() && reply.items.back().first == CM_KERN_REPLY_STATUS;
+        if (!hasStatus) {
+            ASSERT_FALSE(said.empty());
+            EXPECT_TRUE(said.back().starts_with("sb_packbuff_pack_uint32() fails: 45; type: 0, value: "))
+                << said.back();
+            said.pop_back();
+        }
+        if (hasStatus)
+            reply.items.pop_back();
+        const bool all = reply.items.size() == 7;
+        EXPECT_EQ(said, all ? std::vector<std::string>() : std::vector{lineFor(reply.items.size())});
+        EXPECT_EQ(all && hasStatus, size == whole);
+    }
+}
+
+} // namespace
+} // namespace zor::test

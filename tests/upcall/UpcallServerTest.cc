@@ -1,0 +1,425 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "upcall/UpcallServer.h"
+
+#include "upcall/UpcallWorld.h"
+
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/wait.h>
+
+namespace zor::test {
+namespace {
+
+using namespace upcall;
+using support::LogLine;
+
+constexpr const char* routine = "server_get_process_containers";
+constexpr std::uint32_t homeless = 503;
+const std::string dataContainers = std::string(mobileContainers) + "/Data/Application";
+
+ByteVector with(ByteVector packet, std::size_t offset, std::uint32_t number) {
+    std::memcpy(packet.data() + offset, &number, sizeof number);
+    return packet;
+}
+
+ByteVector first(const ByteVector& packet, std::size_t size) {
+    return {packet.begin(), packet.begin() + static_cast<std::ptrdiff_t>(size)};
+}
+
+/// A request of the client's whose buffer is this.
+ByteVector around(const std::string& hex) {
+    return encodeRequest(fromHex(hex));
+}
+
+// Goal: every packet that is no request gets the one code and the lines that it should, and makes nothing. Method: a
+// table of packets, sent by the kernel's agent through a socket.
+TEST(UpcallServer, AnswersEveryFaultyPacket) {
+    const ByteVector good = Items().string(CM_KERN_REQUEST_CONTAINER_ID, "com.example").number(3, mobile).packet();
+    const std::string id = "02 00 00 00 02 00 00 00 61 00 00 00 00 00 00 00 ";
+    const std::string end = "00 00 00 00 00 00 00 00";
+    ByteVector longer = good;
+    longer.push_back(0);
+    struct Row {
+        const char* name;
+        ByteVector packet;
+        std::int32_t code;
+        const char* line; // of level 3
+    };
+    const Row rows[] = {
+        {"another message", with(good, 4, 322'514'901), -303, ""},
+        {"its own reply", with(good, 4, 322'515'000), -303, ""},
+        {"the largest id, cut", first(with(good, 4, 0xFFFFFFFF), 8), -303, ""},
+        {"another message in no form", with(with(good, 4, 7), 0, 0), -303, ""},
+        {"an id alone", first(good, 8), -304, ""},
+        {"a cut header", first(good, 23), -304, ""},
+        {"another size", with(good, 0, 51), -304, ""},
+        {"no descriptor", with(good, 8, 0), -304, ""},
+        {"two descriptors", with(good, 8, 2), -304, ""},
+        {"no descriptor, not out of line", with(with(good, 8, 0), 12, 0), -304, ""},
+        {"not out of line", with(good, 12, 0), -300, ""},
+        {"a larger size", with(good, 16, 41), -300, ""},
+        {"a larger count", with(good, 20, 41), -300, ""},
+        {"a huge size and count", with(with(good, 16, 0xFFFFFFFF), 20, 0xFFFFFFFF), -300, ""},
+        {"more bytes", longer, -300, ""},
+        {"fewer bytes", first(good, good.size() - 1), -300, ""},
+        {"a header alone", first(good, 24), -300, ""},
+        {"an empty buffer", around(""), 9, "sb_packbuff_init() of request data fails"},
+        {"less than an item", around("00 00 00 00 00 00 00"), 5, "failed: to find the end of the request. error: 34"},
+        {"a cut end", around("01 00 03 00 f5 01 00 00 00 00"), 5, "failed: to find the end of the request. error: 34"},
+        {"no end", around(id), 5, "failed: to unpack string for CM_KERN_REQUEST_CODE_SIGNATURE_ID. error: 34"},
+        {"a number for the code signature", Items().number(0, 1).packet(), 5,
+         "failed: to unpack string for CM_KERN_REQUEST_CODE_SIGNATURE_ID. error: 22"},
+        {"bytes for the container", Items().bytes(1, "a").packet(), 5,
+         "failed: to unpack string for CM_KERN_REQUEST_CONTAINER_ID. error: 22"},
+        {"an unknown item for the application", around("07 00 02 00 02 00 00 00" + end), 5,
+         "failed: to unpack string for CM_KERN_REQUEST_APPLICATION_ID. error: 22"},
+        {"a string for the persona", Items().string(3, "501").packet(), 5,
+         "failed: to unpack uint32 for CM_KERN_REQUEST_PERSONA_ID. error: 22"},
+        {"an empty item for a group", around("02 00 04 00 00 00 00 00" + end), 5,
+         "failed: to unpack string for CM_KERN_REQUEST_APP_GROUP_ID. error: 22"},
+        {"no NUL in the system container", around("02 00 06 00 01 00 00 00 61 00 00 00 00 00 00 00" + end), 5,
+         "failed: to unpack string for CM_KERN_REQUEST_SYSTEM_CONTAINER_ID. error: 22"},
+        {"a system group beyond the end", around("02 00 07 00 ff ff ff ff 61 00 00 00 00 00 00 00" + end), 5,
+         "failed: to unpack string for CM_KERN_REQUEST_SYSTEM_GROUP_CONTAINER_ID. error: 34"},
+        {"a container type", Items().string(0, "com.example").number(3, mobile).number(5, 2).packet(), 4,
+         "CM_KERN_REQUEST_CONTAINER_TYPE is not currently supported!"},
+        {"the first unknown item", Items().string(0, "com.example").number(3, mobile).string(8, "a").packet(), 4,
+         "unexpected value: 8"},
+        {"the last unknown item", Items().string(0xFFFF, "a").packet(), 4, "unexpected value: 65535"},
+    };
+    ServedUpcall upcall;
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.name);
+        const UpcallReply reply = replyIn(upcall.exchange(row.packet));
+        std::uint32_t messageId = 0;
+        std::memcpy(&messageId, row.packet.data() + 4, sizeof messageId);
+        EXPECT_EQ(reply.messageId, messageId + 100);
+        EXPECT_EQ(reply.returnCode, row.code);
+        EXPECT_FALSE(reply.bufferBytes);
+        std::vector<LogLine> expected;
+        if (*row.line != '\0')
+            expected = {{logLevelError, routine, row.line}};
+        EXPECT_EQ(upcall.world.log.take(), expected);
+    }
+    // One that is too short to have an id gets no answer; the next one does.
+    const platform::FileDescriptor socket = upcall.connect();
+    sendPacket(socket.get(), first(good, 7));
+    sendPacket(socket.get(), with(good, 4, 1));
+    EXPECT_EQ(replyIn(receivePacket(socket.get())).messageId, 101U);
+    EXPECT_TRUE(upcall.world.names(dataContainers).empty());
+}
+
+// Goal: nobody but the kernel's agent is answered: not an unregistered program, and not another process on the agent's
+// own connection. Method: real senders; only a sender that is not known at all has to be made up.
+TEST(UpcallServer, AnswersTheKernelAlone) {
+    const ByteVector good = Items().string(CM_KERN_REQUEST_CONTAINER_ID, "com.example").number(3, mobile).packet();
+    ServedUpcall unknown(Agent::unknown);
+    EXPECT_EQ(replyIn(unknown.exchange(good)).returnCode, 5);
+    EXPECT_EQ(replyIn(unknown.exchange(with(good, 4, 1))).returnCode, -303);
+    EXPECT_TRUE(unknown.world.names(dataContainers).empty());
+
+    ServedUpcall upcall;
+    const platform::FileDescriptor socket = upcall.connect();
+    const pid_t child = ::fork();
+    if (child == 0) {
+        (void)!::send(socket.get(), good.data(), good.size(), MSG_NOSIGNAL);
+        ::_exit(0);
+    }
+    EXPECT_EQ(replyIn(receivePacket(socket.get())).returnCode, 5);
+    ::waitpid(child, nullptr, 0);
+    EXPECT_TRUE(upcall.world.names(dataContainers).empty());
+    sendPacket(socket.get(), good);
+    EXPECT_EQ(replyIn(receivePacket(socket.get())).returnCode, 0);
+
+    World world;
+    const NoPort port;
+    UpcallServer server(world.services().store(), port);
+    EXPECT_EQ(replyIn(server.answer({.bytes = good, .senderPid = {}, .senderUserId = {}})).returnCode, -309);
+    const ByteVector another = with(good, 12, 0);
+    EXPECT_EQ(replyIn(server.answer({.bytes = another, .senderPid = {}, .senderUserId = {}})).returnCode, -300);
+    EXPECT_EQ(replyIn(server.answer({.bytes = good, .senderPid = 1, .senderUserId = 0})).returnCode, 5);
+    EXPECT_TRUE(world.names(dataContainers).empty());
+}
+
+// Goal: a request gets the paths of what it names, in the one order, made where they were missing, and of nothing else.
+// Method: a table of requests; each path is looked at on the disk, each class counted.
+TEST(UpcallServer, TellsTheContainersOfAProcess) {
+    struct Row {
+        const char* name;
+        Items items;
+        std::vector<unsigned> types;
+        const char* home; // below the root
+        std::string dataIdentifier;
+    };
+    const std::string mobileHome = "private/var/mobile";
+    const Row rows[] = {
+        {"nothing", Items(), {100, 0}, "private/var/root", ""},
+        {"code signature alone",
+         Items().string(0, "com.example.signed").number(3, mobile),
+         {100, 1, 2, 0},
+         "private/var/mobile",
+         "com.example.signed"},
+        {"container before code signature",
+         Items().string(1, "com.example.c").string(0, "com.example.s").number(3, mobile),
+         {100, 1, 2, 0},
+         "private/var/mobile",
+         "com.example.c"},
+        {"later ones count",
+         Items().number(3, mobile).string(1, "com.example.1").string(1, "com.example.2").number(3, second),
+         {100, 1, 2, 0},
+         "private/var/second",
+         "com.example.2"},
+        {"application",
+         Items().string(2, "com.example.application").number(3, mobile),
+         {100, 0},
+         "private/var/mobile",
+         ""},
+        {"system container of root's", Items().string(6, "com.example.system"), {100, 101, 0}, "private/var/root", ""},
+        {"everything",
+         Items()
+             .string(7, "sg.b")
+             .string(4, "group.b")
+             .string(6, "com.example.system")
+             .string(0, "com.example.all")
+             .string(4, "group.a")
+             .string(7, "sg.a")
+             .string(4, "group.b")
+             .number(3, mobile)
+             .string(2, "x"),
+         {100, 1, 2, 3, 4, 3, 4, 101, 102, 103, 102, 103, 0},
+         "private/var/mobile",
+         "com.example.all"},
+        {"a user without containers", Items().number(3, 33), {0}, "", ""},
+        {"a user without a home",
+         Items().number(3, homeless).string(7, "sg.a"),
+         {100, 102, 103, 0},
+         "private/var/nowhere",
+         ""},
+    };
+    ServedUpcall upcall;
+    World& world = upcall.world;
+    EXPECT_FALSE(world.daemonsClient().allowGroupIdLookup());
+    for (const Row& row : rows)
+        for (const bool again : {false, true}) {
+            SCOPED_TRACE(std::string(row.name) + (again ? " again" : ""));
+            const UpcallReply reply = upcall.ask(row.items);
+            EXPECT_EQ(reply.messageId, 322'515'000U);
+            EXPECT_EQ(reply.returnCode, 0);
+            EXPECT_EQ(reply.types(), row.types);
+            EXPECT_EQ(reply.text(0), "1");
+            EXPECT_EQ(reply.text(100), *row.home == '\0' ? "" : world.path(row.home));
+            if (!row.dataIdentifier.empty()) {
+                const std::uint32_t user = reply.text(100).ends_with("second") ? second : mobile;
+                const auto found = world.daemonsClient().createOrLookupContainerForUser(
+                    user, &row.dataIdentifier, ContainerClass::dataApplication, {});
+                ASSERT_TRUE(found);
+                EXPECT_EQ(reply.text(1), found->path);
+                EXPECT_EQ(reply.text(2), found->path + "/tmp");
+                EXPECT_EQ(itemAt(reply.text(2)), directoryOf(user));
+            }
+        }
+    EXPECT_TRUE(world.daemonsClient().allowGroupIdLookup());
+    EXPECT_TRUE(world.daemonsClient().allowOtherIdLookup());
+    const UpcallReply all = upcall.ask(rows[6].items);
+    const auto groupsAre = [&](unsigned type, std::uint32_t user, ContainerClass containerClass,
+                               const std::vector<std::string>& identifiers) {
+        const auto groups = all.groups(type);
+        ASSERT_EQ(groups.size(), identifiers.size());
+        for (std::size_t i = 0; i < groups.size(); ++i) {
+            EXPECT_EQ(groups[i].first, identifiers[i]);
+            const auto found =
+                world.daemonsClient().createOrLookupContainerForUser(user, &identifiers[i], containerClass, {});
+            ASSERT_TRUE(found);
+            EXPECT_EQ(groups[i].second, found->path);
+            EXPECT_TRUE(itemAt(found->path).starts_with("directory"));
+        }
+    };
+    groupsAre(3, mobile, ContainerClass::sharedAppGroup, {"group.a", "group.b"});
+    groupsAre(102, 499, ContainerClass::sharedSystemGroup, {"sg.a", "sg.b"});
+    EXPECT_EQ(world.names(dataContainers).size(), 3U);
+    EXPECT_EQ(world.names("private/var/second/Containers/Data/Application").size(), 1U);
+    EXPECT_EQ(world.names("private/var/containers/Data/System").size(), 1U);
+}
+
+// Goal: when one container cannot be had, the others are made and no path is told. Method: each kind in turn with an
+// identifier that no file can hold, between two good groups.
+TEST(UpcallServer, TellsAllOrNothing) {
+    struct Row {
+        const char* name;
+        std::uint16_t type;
+        std::string_view identifier;
+        std::uint32_t persona;
+        const char* line;
+    };
+    constexpr std::string_view cut("group.a\0b", 9);
+    const Row rows[] = {
+        {"data container", 1, "\xff", mobile, "createOrLookupContainerForUser: Failed with error: 34"},
+        {"system container", 6, cut, mobile, "createOrLookupContainerForUser:(system container) Failed with error: 34"},
+        {"group", 4, cut, mobile, "createOrLookupGroupContainersForUser: Failed with error: 34"},
+        {"system group", 7, "\xc3", mobile,
+         "createOrLookupContainerForUser:(system group container) Failed with error: 34"},
+        {"persona that owns none", 1, "com.example", 0, "createOrLookupContainerForUser: Failed with error: 11"},
+    };
+    ServedUpcall upcall;
+    World& world = upcall.world;
+    int made = 0;
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.name);
+        ++made;
+        const std::string before = "sg.before" + std::to_string(made);
+        const std::string after = "sg.after" + std::to_string(made);
+        const UpcallReply reply = upcall.ask(
+            Items().number(3, row.persona).string(7, before).string(row.type, row.identifier).string(7, after));
+        EXPECT_EQ(reply.returnCode, 0);
+        EXPECT_EQ(reply.items, (std::vector<std::pair<unsigned, std::string>>{{0, "0"}}));
+        EXPECT_EQ(reply.bufferBytes, 16U);
+        EXPECT_EQ(world.log.take(logLevelError, routine), std::vector<std::string>{row.line});
+        EXPECT_EQ(world.names("private/var/containers/Shared/SystemGroup").size(), static_cast<std::size_t>(2 * made));
+    }
+    world.drainDeathRow();
+    EXPECT_TRUE(world.names(std::string(cachesPath) + "/Staging").empty());
+    EXPECT_TRUE(world.names(dataContainers).empty());
+    // The disk refuses the second of two groups.
+    world.disk().arm({.point = 2, .error = ENOSPC, .filter = [](const support::DiskCallInfo& call) {
+                          return call.call == support::DiskCall::rename && call.subject.find("/") == std::string::npos;
+                      }});
+    const UpcallReply reply = upcall.ask(Items().number(3, mobile).string(4, "group.1").string(4, "group.2"));
+    EXPECT_TRUE(world.disk().met());
+    world.disk().disarm();
+    EXPECT_EQ(reply.items, (std::vector<std::pair<unsigned, std::string>>{{0, "0"}}));
+    EXPECT_EQ(upcall.ask(Items().number(3, mobile).string(4, "group.1").string(4, "group.2")).types(),
+              (std::vector<unsigned>{100, 3, 4, 3, 4, 0}));
+}
+
+// Goal: at level 7 a request leaves these lines in this order, and at level 5 none. Method: whole logs, addresses taken
+// out.
+TEST(UpcallServer, TracesARequest) {
+    const Items items = Items().string(0, "com.example").number(3, mobile).string(4, "group.a");
+    ServedUpcall silent;
+    (void)silent.ask(items);
+    EXPECT_EQ(silent.world.log.take(), std::vector<LogLine>());
+
+    ServedUpcall upcall(Agent::registered, {.logLevel = logLevelDebug});
+    const UpcallReply reply = upcall.ask(items);
+    std::vector<std::string> said;
+    for (const LogLine& line : upcall.world.log.take())
+        if (line.function == "demux_server" || line.function == routine)
+            said.push_back(std::to_string(line.level) + " " + line.function + ": " +
+                           line.message.substr(0, line.message.find(" (0x")) +
+                           (line.message.find(" (0x") == std::string::npos ? "" : " (ADDRESS)"));
+    for (std::string& line : said)
+        for (std::size_t at = line.find("0x"); at != std::string::npos; at = line.find("0x"))
+            line.replace(at, line.find_first_not_of("0123456789abcdef", at + 2) - at, "ADDRESS");
+    const std::string data = reply.text(1);
+    const std::string prefix = "7 " + std::string(routine) + ": ";
+    EXPECT_EQ(said, (std::vector<std::string>{
+                        "7 demux_server: in demux_server(); request->msgh_id: 322514900",
+                        "7 demux_server: handling incomming request for container_manager server",
+                        prefix + "request size: " + std::to_string(items.buffer().size()) + " (ADDRESS)",
+                        prefix + "request packbuff byte address:ADDRESS",
+                        prefix + "UPCALL-Containers for com.example(501):",
+                        prefix + "dataContainerURL: " + data,
+                        prefix + "tempContainerURL: " + data + "/tmp",
+                        prefix + "homeDirURL: " + upcall.world.path("private/var/mobile"),
+                        prefix + "groupURLs: {\"group.a\" = \"" + reply.text(4) + "\"}",
+                        prefix + "systemContainerURL: (null)",
+                        prefix + "systemGroupURLs: {}",
+                        prefix + "packbuff bytes: ADDRESS, reply bytes: ADDRESS, reply size: " +
+                            std::to_string(reply.bufferBytes.value_or(0)),
+                        "7 demux_server: container_manager server returns: 0",
+                    }));
+    (void)upcall.exchange(with(items.packet(), 4, 0x80000000));
+    EXPECT_EQ(upcall.world.log.take(),
+              (std::vector<LogLine>{{7, "demux_server", "in demux_server(); request->msgh_id: -2147483648"}}));
+    (void)upcall.ask(Items().number(3, mobile).string(1, "\xff"));
+    const auto failed = upcall.world.log.take();
+    for (const char* line : {"dataContainerURL: (null)", "tempContainerURL: (null)", "homeDirURL: (null)",
+                             "groupURLs: (null)", "systemContainerURL: (null)", "systemGroupURLs: (null)"})
+        EXPECT_TRUE(support::hasLine(failed, 7, routine, line)) << line;
+}
+
+// Goal: a reply that the port cannot send is an empty buffer, one that it just can is whole. Method: a port of a size
+// of the test's, around the size of one reply; whatever is thrown in the routine is answered as well.
+TEST(UpcallServer, AnswersWhatCannotBeSent) {
+    World world;
+    NoPort port;
+    UpcallServer server(world.services().store(), port);
+    const ByteVector packet = Items().string(0, "com.example").number(3, mobile).packet();
+    const platform::UpcallPacket sent{.bytes = packet, .senderPid = 0, .senderUserId = 0};
+    const ByteVector whole = server.answer(sent);
+    EXPECT_EQ(replyIn(whole).types(), (std::vector<unsigned>{100, 1, 2, 0}));
+    port.bytesMax = whole.size();
+    EXPECT_EQ(toHex(server.answer(sent)), toHex(whole));
+    world.log.take();
+    port.bytesMax = whole.size() - 1;
+    const UpcallReply reply = replyIn(server.answer(sent));
+    EXPECT_EQ(reply.returnCode, 0);
+    EXPECT_EQ(reply.bufferBytes, 0U);
+    const auto said = world.log.take(logLevelError, routine);
+    ASSERT_EQ(said.size(), 1U);
+    EXPECT_TRUE(said[0].starts_with("copyReply(0x")) << said[0];
+    EXPECT_TRUE(said[0].ends_with(", " + std::to_string(whole.size() - 20) + ") fails: 90")) << said[0];
+
+    port.fails = true;
+    EXPECT_EQ(replyIn(server.answer(sent)).returnCode, 9);
+    const auto caught = world.log.take(logLevelError, routine);
+    ASSERT_EQ(caught.size(), 1U);
+    EXPECT_NE(caught[0].find("Got exception: the port failed : "), std::string::npos) << caught[0];
+}
+
+// Goal: the largest replies come whole through the real port, and one that is too large for it as an empty buffer,
+// without a stop of the daemon. Method: groups below a long path, one packet of them after the other, until it happens.
+TEST(UpcallServer, SendsLargeRepliesThroughItsPort) {
+    const support::TemporaryDirectory parent("/dev/shm");
+    std::string deep = parent.path();
+    for (int i = 0; i < 10; ++i) {
+        deep += "/" + std::string(250, 'd');
+        ASSERT_EQ(::mkdir(deep.c_str(), 0755), 0);
+    }
+    ASSERT_EQ(::chmod(parent.path().c_str(), 0755), 0);
+    ServedUpcall upcall(Agent::registered, {.parent = deep});
+    const std::size_t bytesMax = upcall.world.linux().roles().upcallPort.replyBytesMax();
+    std::size_t largest = 0;
+    bool wasEmpty = false;
+    for (int groups = 32; groups <= 1024 && !wasEmpty; groups *= 2) {
+        Items items;
+        items.number(3, mobile);
+        for (int i = 0; i < groups; ++i)
+            items.string(4, "g" + std::to_string(i));
+        const UpcallReply reply = upcall.ask(items);
+        ASSERT_EQ(reply.returnCode, 0);
+        ASSERT_TRUE(reply.bufferBytes);
+        wasEmpty = *reply.bufferBytes == 0;
+        if (!wasEmpty) {
+            largest = *reply.bufferBytes;
+            ASSERT_EQ(reply.groups(3).size(), static_cast<std::size_t>(groups));
+            ASSERT_EQ(reply.text(0), "1");
+        }
+    }
+    EXPECT_TRUE(wasEmpty);
+    EXPECT_GT(largest, bytesMax / 4);
+    EXPECT_EQ(upcall.ask(Items().number(3, mobile).string(4, "g1")).types(), (std::vector<unsigned>{100, 3, 4, 0}));
+}
+
+// Goal: while a lookup takes long, what waits is bounded by the socket and costs the daemon nothing; then all of it is
+// answered. Method: the lock that every lookup takes is held, and packets are sent until the socket takes no more.
+TEST(UpcallServer, ASlowLookupBoundsWhatWaits) {
+    ServedUpcall upcall;
+    const ByteVector packet = Items().string(0, "com.example").number(3, mobile).packet();
+    const platform::FileDescriptor socket = upcall.connect();
+    int sent = 0;
+    {
+        const AllIdentifiersLock slow(upcall.world.services().locks(), LockMode::writing);
+        constexpr int packetsMax = 100'000;
+        while (sent < packetsMax && ::send(socket.get(), packet.data(), packet.size(), MSG_DONTWAIT) > 0)
+            ++sent;
+        EXPECT_EQ(errno, EAGAIN);
+        EXPECT_GT(sent, 1);
+        EXPECT_LT(sent, packetsMax / 10);
+    }
+    for (int i = 0; i < sent; ++i)
+        ASSERT_EQ(replyIn(receivePacket(socket.get())).types(), (std::vector<unsigned>{100, 1, 2, 0})) << i;
+}
+
+} // namespace
+} // namespace zor::test
