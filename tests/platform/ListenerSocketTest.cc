@@ -135,7 +135,7 @@ private:
 TEST(ListenerStatus, EveryPeerGetsOneReplyAndTheEnd) {
     const support::ProcessResources before;
     {
-        StatusWorld world([](Peer& peer) -> plist::Dictionary {
+        StatusWorld world([](Peer& peer, StatusSocket::Detail) -> plist::Dictionary {
             return {{"Peer", plist::Dictionary{{"PID", static_cast<std::uint64_t>(peer.pid())}}},
                     {"Padding", plist::Data(300'000, 1)}};
         });
@@ -157,6 +157,21 @@ TEST(ListenerStatus, EveryPeerGetsOneReplyAndTheEnd) {
         EXPECT_TRUE(eventually([&] { return world.identity.peers == 0; }));
     }
     EXPECT_EQ(before.leakedSince(), "");
+}
+
+// Goal: what does not fit into a socket's buffer costs a peer the details, not the answer. Method: a full form larger
+// than a frame may be.
+TEST(ListenerStatus, TooMuchIsToldBriefly) {
+    StatusWorld world([](Peer&, StatusSocket::Detail detail) -> plist::Dictionary {
+        if (detail == StatusSocket::Detail::brief)
+            return {{"Brief", true}};
+        return {{"Padding", plist::Data(std::size_t{17} << 20, 1)}};
+    });
+    RawClient client(world.directory.shortPath());
+    const std::optional<Reply> reply = client.receive();
+    ASSERT_TRUE(reply);
+    EXPECT_TRUE(reply->message.isTrue("Brief"));
+    EXPECT_TRUE(client.ended());
 }
 
 } // namespace

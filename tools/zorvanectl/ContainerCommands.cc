@@ -1,4 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
+// Making, finding, listing and deleting containers, and asking how the daemon is.
 #include "Commands.h"
 #include "RegisteredEntitlements.h"
 

@@ -4,9 +4,6 @@
 #include "RegisteredEntitlements.h"
 
 #include <cstdio>
-#include <fstream>
-#include <iostream>
-#include <iterator>
 
 namespace zorvanectl {
 
@@ -47,20 +44,30 @@ std::optional<zorvane::Value> fromJson(const nlohmann::json& json) {
     return value;
 }
 
+/// Everything that a file holds; nullopt when it cannot be read.
+std::optional<std::string> contentOf(const std::string& file) {
+    std::FILE* input = file == "-" ? stdin : std::fopen(file.c_str(), "re");
+    if (!input)
+        return std::nullopt;
+    std::string content;
+    char buffer[4096];
+    while (const std::size_t count = std::fread(buffer, 1, sizeof buffer, input))
+        content.append(buffer, count);
+    const bool failed = std::ferror(input) != 0;
+    if (input != stdin)
+        std::fclose(input);
+    return failed ? std::nullopt : std::optional(std::move(content));
+}
+
 /// The object in a file; nullopt, said on standard error, when there is none.
 std::optional<zorvane::Map> readFile(const std::string& file) {
-    std::ifstream opened;
-    if (file != "-")
-        opened.open(file);
-    std::istream& input = file == "-" ? std::cin : opened;
-    const std::string text((std::istreambuf_iterator<char>(input)), std::istreambuf_iterator<char>());
-    const bool unreadable = input.bad() || (file != "-" && !opened.is_open());
-    const auto json = nlohmann::json::parse(text, nullptr, false);
-    if (!unreadable && json.is_object())
+    const auto content = contentOf(file);
+    const auto json = nlohmann::json::parse(content.value_or(""), nullptr, false);
+    if (json.is_object())
         if (auto value = fromJson(json))
             return std::get<zorvane::Map>(std::move(value->content));
     std::fprintf(stderr, "zorvanectl: %s %s\n", printable(file).c_str(),
-                 unreadable ? "cannot be read" : "holds no JSON object without null");
+                 content ? "holds no JSON object without null" : "cannot be read");
     return std::nullopt;
 }
 
