@@ -11,6 +11,8 @@ namespace zor::bench {
 
 /// One client asks for a container that is there: LookupBench.cc.
 std::vector<Figure> measureLookup(const Settings& settings);
+/// What entitlements cost a request: RegistrationBench.cc.
+std::vector<Figure> measureRegistration(const Settings& settings);
 /// Many do: ThroughputBench.cc.
 std::vector<Figure> measureThroughput(const Settings& settings);
 /// Containers are made: CreateBench.cc.

@@ -2,10 +2,12 @@
 #include "Client.h"
 
 #include "Processes.h"
+#include "Statistics.h"
 #include "ipc/Frame.h"
 #include "ipc/Keys.h"
 #include "plist/Binary.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <fcntl.h>
@@ -32,6 +34,10 @@ Frame containerRequest(const std::string& identifier, ContainerClass containerCl
     };
     if (create == Create::yes)
         request.set(ipc::keys::createIfNecessary, true);
+    return requestFrame(request);
+}
+
+Frame requestFrame(const plist::Dictionary& request) {
     Frame frame(ipc::frameHeaderBytes);
     if (!plist::appendBinary(request, frame))
         throw Failure("a request cannot be written");
@@ -84,6 +90,19 @@ std::span<const std::uint8_t> Client::receive() {
             throw Failure("a reply is too long");
     }
     return std::span(buffer_).first(wanted);
+}
+
+std::vector<double> roundTrips(Client& client, const Frame& request, const Frame& reply, int count) {
+    std::vector<double> microseconds;
+    microseconds.reserve(static_cast<std::size_t>(count));
+    for (int i = 0; i < count; ++i) {
+        const auto begin = Clock::now();
+        const auto received = client.exchange(request);
+        microseconds.push_back(secondsSince(begin) * 1e6);
+        if (!std::ranges::equal(received, reply))
+            throw Failure("two replies to one request differ");
+    }
+    return microseconds;
 }
 
 plist::Dictionary replyOf(std::span<const std::uint8_t> frame) {

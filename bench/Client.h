@@ -19,6 +19,8 @@ using Frame = std::vector<std::uint8_t>;
 /// The user of all containers here.
 constexpr std::uint32_t userId = 501;
 
+/// A whole frame of a request.
+[[nodiscard]] Frame requestFrame(const plist::Dictionary& request);
 enum class Create { no, yes };
 /// A whole frame: find the container, or make it.
 [[nodiscard]] Frame containerRequest(const std::string& identifier, ContainerClass containerClass, Create create);
@@ -41,6 +43,9 @@ private:
     platform::FileDescriptor socket_;
     Frame buffer_;
 };
+
+/// How long each of `count` exchanges took, in microseconds. Another reply than `reply` is a failure.
+[[nodiscard]] std::vector<double> roundTrips(Client& client, const Frame& request, const Frame& reply, int count);
 
 /// The dictionary in a reply frame.
 [[nodiscard]] plist::Dictionary replyOf(std::span<const std::uint8_t> frame);

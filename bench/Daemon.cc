@@ -60,7 +60,7 @@ void prepareRoot(const Settings& settings, const std::string& root) {
     writeFile(root + "/" + platform::names::passwordFile,
               {reinterpret_cast<const std::uint8_t*>(passwords.data()), passwords.size()});
     const plist::Dictionary entry{
-        {"Identifier", "com.veltra.zorvane-bench"},
+        {"Identifier", benchIdentifier},
         {"Executable", settings.ownProgram},
         {"Entitlements", plist::Dictionary{{std::string(platform::entitlementKeys::allowed), true}}},
     };

@@ -25,6 +25,8 @@ struct Settings {
     [[nodiscard]] int rounds(int full, int quickly) const { return quick ? quickly : full; }
 };
 
+/// Whom the registry of a root takes this program for.
+inline constexpr const char* benchIdentifier = "com.veltra.zorvane-bench";
 /// Makes what a daemon needs to find below `root`, which exists and is empty.
 void prepareRoot(const Settings& settings, const std::string& root);
 /// The class directory of `userId` in a root, made with the owner that the daemon gives it.

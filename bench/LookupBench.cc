@@ -4,27 +4,7 @@
 #include "Benchmarks.h"
 #include "Echo.h"
 
-#include <algorithm>
-#include <cstring>
-
 namespace zor::bench {
-
-namespace {
-
-std::vector<double> roundTrips(Client& client, const Frame& request, const Frame& reply, int count) {
-    std::vector<double> microseconds;
-    microseconds.reserve(static_cast<std::size_t>(count));
-    for (int i = 0; i < count; ++i) {
-        const auto begin = Clock::now();
-        const auto received = client.exchange(request);
-        microseconds.push_back(secondsSince(begin) * 1e6);
-        if (!std::ranges::equal(received, reply))
-            throw Failure("two replies to one request differ");
-    }
-    return microseconds;
-}
-
-} // namespace
 
 std::vector<Figure> measureLookup(const Settings& settings) {
     const int blocks = settings.rounds(31, 11);
