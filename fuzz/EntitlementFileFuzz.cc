@@ -1,21 +1,21 @@
 // SPDX-License-Identifier: Apache-2.0
-// Any bytes as the entitlement file of a daemon: it starts, answers every question about every key, and takes a change
-// whose result the next daemon reads. Runs over one root in memory that lives as long as the fuzzer.
-#include "entitlements/ZOREntitlementMapping.h"
+// Any bytes as the entitlement file of a daemon: it starts, answers every question about every key, processes changes
+// of them, and takes a change whose result the next daemon reads. Runs over one root in memory that lives as long as
+// the fuzzer.
+#include "daemon/Composition.h"
 #include "fs/AtomicFile.h"
 #include "fs/DictionaryFile.h"
 #include "fs/RecursiveRemove.h"
-#include "platform/linux/FileDeviceLockState.h"
-#include "platform/linux/LinuxDisk.h"
-#include "platform/linux/LinuxPasswordDatabase.h"
-#include "platform/linux/SystemRoot.h"
-#include "platform/linux/XattrProtectionClass.h"
+#include "platform/linux/LinuxPlatform.h"
 #include "store/Names.h"
 
 #include <algorithm>
+#include <cstdio>
 #include <cstdlib>
 #include <fcntl.h>
+#include <memory>
 #include <optional>
+#include <source_location>
 #include <string>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -24,9 +24,11 @@ namespace {
 
 using namespace zor;
 
-void require(bool holds) {
-    if (!holds)
-        std::abort();
+void require(bool holds, std::source_location where = std::source_location::current()) {
+    if (holds)
+        return;
+    std::fprintf(stderr, "line %u does not hold\n", where.line());
+    std::abort();
 }
 
 class Silence final : public platform::PlatformLog {
@@ -41,56 +43,75 @@ public:
 
 class Device {
 public:
-    Device() : root_(makeRoot()) {
-        require(root_.makeRuntimeDirectory(disk_) == 0);
-        library_ = root_.path("/private/var/root/Library/Zorvane");
+    Device() : path_(makeRoot()), platform_(openPlatform(path_)) {
+        library_ = path_ + "/private/var/root/Library/Zorvane";
         file_ = FileURL::file(library_ + "/" + names::entitlementFile);
-        configuration_.libraryDirectory();
+        Composition(roles()).configuration().libraryDirectory();
     }
     ~Device() {
         const platform::FileDescriptor parent(::open("/dev/shm", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-        const std::string& path = root_.canonicalPath();
-        (void)fs::removeTree(disk_, parent.get(), path.c_str() + path.rfind('/') + 1);
+        (void)fs::removeTree(platform_->roles().disk, parent.get(), path_.c_str() + path_.rfind('/') + 1);
     }
     Device(const Device&) = delete;
     Device& operator=(const Device&) = delete;
 
-    void put(std::span<const std::uint8_t> bytes) {
-        const auto parent = fileManager_.resolver().openParent(file_);
-        require(parent && fs::replaceFileDurably(disk_, parent->directory.get(), parent->name, 0644, bytes) == 0);
+    void put(Composition& composition, std::span<const std::uint8_t> bytes) {
+        const auto parent = composition.defaultManager().resolver().openParent(file_);
+        require(parent && fs::replaceFileDurably(platform_->roles().disk, parent->directory.get(), parent->name, 0644,
+                                                 bytes) == 0);
         ::unlink((library_ + "/" + names::unreadableEntitlementFile).c_str());
     }
-    [[nodiscard]] std::optional<plist::Dictionary> read() {
-        auto dictionary = readDictionaryAtURL(file_, std::size_t{1} << 26, fileManager_);
+    [[nodiscard]] std::optional<plist::Dictionary> read(Composition& composition) {
+        auto dictionary = readDictionaryAtURL(file_, std::size_t{1} << 26, composition.defaultManager());
         return dictionary ? std::optional(std::move(*dictionary)) : std::nullopt;
     }
-
-    Silence sink;
-    Log log{sink};
+    /// The platform's, with a log that keeps nothing.
+    [[nodiscard]] platform::Platform roles() {
+        const platform::Platform real = platform_->roles();
+        return {.root = real.root,
+                .disk = real.disk,
+                .log = sink_,
+                .internalBuild = real.internalBuild,
+                .systemVersion = real.systemVersion,
+                .passwords = real.passwords,
+                .lockState = real.lockState,
+                .protection = real.protection,
+                .sandbox = real.sandbox,
+                .crash = real.crash,
+                .bootMarker = real.bootMarker,
+                .transactions = real.transactions,
+                .deathRowQueue = real.deathRowQueue,
+                .lockStateQueue = real.lockStateQueue,
+                .runLoop = real.runLoop,
+                .peers = real.peers,
+                .listener = real.listener,
+                .upcallPort = real.upcallPort};
+    }
 
 private:
-    static platform::SystemRoot makeRoot() {
+    static std::string makeRoot() {
         char path[] = "/dev/shm/zorvane-fuzz.XXXXXX";
         require(::mkdtemp(path) != nullptr);
-        const std::string root = path;
-        for (const char* directory : {"/private", "/private/var", "/private/var/root"})
+        std::string root = path;
+        for (const char* directory :
+             {"/private", "/private/var", "/private/var/root", "/private/var/brevad", "/etc", "/tmp"})
             require(::mkdir((root + directory).c_str(), 0755) == 0);
-        auto opened = platform::SystemRoot::open(root);
+        const platform::FileDescriptor passwords(
+            ::open((root + "/etc/passwd").c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0644));
+        require(passwords.valid());
+        return root;
+    }
+    static std::unique_ptr<platform::LinuxPlatform> openPlatform(const std::string& root) {
+        auto opened = platform::LinuxPlatform::open({.rootDirectory = root, .syncs = platform::Syncs::off});
         require(opened.has_value());
         return std::move(*opened);
     }
 
-    platform::LinuxDisk disk_{platform::Syncs::off};
-    platform::SystemRoot root_;
-    platform::FileDeviceLockState lockState_{root_};
-    platform::XattrProtectionClass protection_{root_, disk_, lockState_};
-    platform::LinuxPasswordDatabase passwords_{root_};
-    ZORFileManager fileManager_{log, root_, disk_, protection_};
-    ZORGlobalConfiguration configuration_{log, fileManager_, passwords_};
+    Silence sink_;
+    const std::string path_;
+    std::unique_ptr<platform::LinuxPlatform> platform_;
     std::string library_;
     FileURL file_;
-
-    friend void run(Device&, std::span<const std::uint8_t>);
 };
 
 void ask(ZOREntitlementMapping& mapping, const std::string& key) {
@@ -104,20 +125,36 @@ void ask(ZOREntitlementMapping& mapping, const std::string& key) {
             require(group.starts_with("systemgroup."));
 }
 
+/// Registers another group for a key and drops everything again.
+void change(ZOREntitlementMapping& mapping, const std::string& key) {
+    const bool reserved = key == entitlementMapKeys::childPluginBundleIds ||
+                          key == entitlementMapKeys::registeredByCaller || key == entitlementMapKeys::placeholder;
+    const plist::Dictionary entitlements{{std::string(entitlementKeys::applicationGroups), plist::Array{"h"}}};
+    const ErrorCode expected = reserved ? ErrorCode::invalidObject : ErrorCode::success;
+    require(mapping.processEntitlements(&entitlements, &key, nullptr) == expected);
+    require(mapping.processEntitlements(nullptr, &key, nullptr) == expected);
+    require(reserved || !mapping.entitlementsExistForIdentifier(key));
+}
+
 void run(Device& device, std::span<const std::uint8_t> bytes) {
-    device.put(bytes);
-    const auto content = device.read();
-    ZOREntitlementMapping mapping(device.log, device.fileManager_, device.configuration_);
+    Composition composition(device.roles());
+    device.put(composition, bytes);
+    const auto content = device.read(composition);
+    ZOREntitlementMapping& mapping = composition.entitlements();
     require(mapping.lostFile().has_value() == !content.has_value());
     require(mapping.entryCount() == (content ? content->size() : 0));
-    if (content)
-        for (const auto& [key, value] : *content)
-            ask(mapping, key);
-    const plist::Dictionary value{{"com.veltra.security.application-groups", "g"}};
+    const plist::Dictionary value{{std::string(entitlementKeys::applicationGroups), "g"}};
     require(mapping._setEntitlementDictionaryValues({value}, {"added.by.the.fuzzer"}).has_value());
-    ZOREntitlementMapping next(device.log, device.fileManager_, device.configuration_);
-    require(next.entryCount() == mapping.entryCount());
-    require(next.appGroupIdentifiersForIdentifier("added.by.the.fuzzer") == std::vector<std::string>{"g"});
+    int changes = 2;
+    for (const auto& [key, entry] : content.value_or(plist::Dictionary()))
+        ask(mapping, key);
+    for (const auto& [key, entry] : content.value_or(plist::Dictionary()))
+        if (key != "added.by.the.fuzzer" && --changes >= 0)
+            change(mapping, key);
+    Composition next(device.roles());
+    require(next.entitlements().entryCount() == mapping.entryCount());
+    require(next.entitlements().appGroupIdentifiersForIdentifier("added.by.the.fuzzer") ==
+            std::vector<std::string>{"g"});
 }
 
 } // namespace
