@@ -311,7 +311,7 @@ TEST(Packbuff, PrintsItsItems) {
                   "   2:ADDRESS -- value type 5 --bytes (ADDRESS, 5 pad bytes, size: 3)\n"
                   "*  3: ADDRESS -- END\n");
     ByteVector bytes = fromHex("09 00 01 00 08 00 00 00  02 00 01 00 20 00 00 00  61 62 63 64 65 66 67 68");
-    for (const auto& [type, name] : {std::pair{packbuffDeallocNone, "None"}, {PackbuffDealloc(7), "<Unknown>"}}) {
+    for (const auto& [type, name] : {std::pair{0U, "None"}, {7U, "<Unknown>"}}) {
         const PackbuffPointer reader(sb_packbuff_init_with_buffer(bytes.data(), bytes.size(), true, type));
         EXPECT_EQ(withoutAddresses(printed(reader.get())),
                   headWith({{"%B", "0"}, {"%D", name}, {"%A", "24"}, {"%U", "24"}, {"%R", "0"}}) +

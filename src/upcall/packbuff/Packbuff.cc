@@ -204,7 +204,7 @@ void printItem(const ItemHeader& header, const std::uint8_t* start, std::size_t 
 } // namespace
 
 sb_packbuff* sb_packbuff_new(std::uint32_t blockSize) {
-    auto* const packbuff = new (std::nothrow) sb_packbuff{};
+    auto* const packbuff = new (std::nothrow) sb_packbuff;
     if (!packbuff)
         return nullptr;
     packbuff->dealloc_type = packbuffDeallocFree;
@@ -222,7 +222,7 @@ sb_packbuff* sb_packbuff_init_with_buffer(void* buffer, std::size_t size, bool h
     const std::size_t sizeMin = hasContent ? 1 : packbuffHeaderBytes;
     if (!buffer || size < sizeMin || size > bytesMax)
         return nullptr;
-    auto* const packbuff = new (std::nothrow) sb_packbuff{};
+    auto* const packbuff = new (std::nothrow) sb_packbuff;
     if (!packbuff)
         return nullptr;
     packbuff->dealloc_type = deallocType;

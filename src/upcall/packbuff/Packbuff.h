@@ -46,13 +46,13 @@ inline constexpr std::uint32_t packbuffDefaultBlockSize = 256;
 
 // The names of the handle and its operations are those of the other side of the interface.
 struct sb_packbuff {
-    std::uint32_t dealloc_type;
-    std::uint32_t block_size; // growth step in bytes; 0: the buffer cannot grow
-    std::uint32_t bytes_allocated;
-    std::uint32_t bytes_remaining;
-    std::uint32_t bytes_used; // of content, with the end item when writing
-    std::uint8_t* item_buffer;
-    std::uint8_t* item; // the item to be read next, or the end item that the next write replaces
+    std::uint32_t dealloc_type = packbuffDeallocNone;
+    std::uint32_t block_size = 0; // growth step in bytes; 0: the buffer cannot grow
+    std::uint32_t bytes_allocated = 0;
+    std::uint32_t bytes_remaining = 0;
+    std::uint32_t bytes_used = 0; // of content, with the end item when writing
+    std::uint8_t* item_buffer = nullptr;
+    std::uint8_t* item = nullptr; // the item to be read next, or the end item that the next write replaces
 };
 
 /// A writer that grows by `blockSize` bytes (packbuffDefaultBlockSize when that is below 8), or nullptr.
