@@ -33,6 +33,8 @@ class Composition {
 public:
     /// `probe` says how a file system orders what is not synced; tests put their own in its place.
     explicit Composition(platform::Platform platform, fs::Durability::Probe probe = fs::orderingOfFileSystem);
+    /// Says what the log has left out so far.
+    ~Composition() { refusals_.reportAll(); }
     Composition(const Composition&) = delete;
     Composition& operator=(const Composition&) = delete;
 

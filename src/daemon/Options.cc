@@ -82,7 +82,10 @@ std::expected<DaemonOptions, OptionsEnd> parseDaemonOptions(int argumentCount, c
         case ':':
             return std::unexpected(usage(std::string("option '") + arguments[optind - 1] + "' needs a value"));
         default:
-            return std::unexpected(usage(std::string("unknown option '") + arguments[optind - 1] + "'"));
+            // A short one is told by its letter: it may stand among others.
+            return std::unexpected(
+                usage("unknown option '" +
+                      (optopt ? std::string{'-', static_cast<char>(optopt)} : arguments[optind - 1]) + "'"));
         }
     }
 }

@@ -31,11 +31,12 @@ bool RefusalLimiter::admit(uid_t uid) {
     return admitted;
 }
 
-void RefusalLimiter::reportEnded() {
+void RefusalLimiter::reportAll() {
     EndedList ended;
     {
         const MutexLock lock(mutex_);
-        collectEnded(now_(), ended);
+        for (Slot& slot : slots_)
+            take(slot, ended);
     }
     say(ended);
 }

@@ -29,8 +29,8 @@ public:
 
     /// Whether a line about `uid` is to be written now. Reports every count whose second is over before it returns.
     [[nodiscard]] bool admit(uid_t uid);
-    /// Reports every count whose second is over; for a timer, or the end.
-    void reportEnded();
+    /// Reports every count there is: when somebody looks, or at the end.
+    void reportAll();
 
 private:
     struct Slot {

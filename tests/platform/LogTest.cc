@@ -221,13 +221,14 @@ TEST(RefusalLimiter, CountsWhatItLeavesOut) {
     EXPECT_EQ(admitted(502, 1), 1);
     EXPECT_EQ(reported, (std::map<uid_t, std::uint64_t>{{501, 800}}));
     EXPECT_EQ(admitted(501, 300), 200);
-    now += std::chrono::seconds(2);
-    limiter.reportEnded();
-    limiter.reportEnded();
+    limiter.reportAll(); // somebody looks before the second is over
+    limiter.reportAll();
     EXPECT_EQ(reported[501], 900U);
+    EXPECT_EQ(admitted(501, 1), 0) << "looking gives no new lines";
+    now += std::chrono::seconds(2);
     // More users than places, within one second: the count of whoever has to go is told.
-    reported.clear();
     EXPECT_EQ(admitted(1, 201), 200);
+    reported.clear();
     now += std::chrono::milliseconds(1);
     for (uid_t uid = 1000; uid < 1000 + RefusalLimiter::usersMax; ++uid)
         EXPECT_TRUE(limiter.admit(uid));

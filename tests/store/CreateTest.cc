@@ -279,7 +279,7 @@ TEST_F(Create, AFailedStepLeavesNothing) {
              "@ failed: Input/output error\""},
         {"subdirectory", makes("Documents"), once, ErrorCode::subdirectoryFailed,
          "Failed to create sub-dir at " + stagingPath + "@Documents"},
-        {"deeper subdirectory", makes("Library/Caches"), once, ErrorCode::subdirectoryFailed,
+        {"deeper subdirectory", makes("Caches"), once, ErrorCode::subdirectoryFailed,
          "Failed to create sub-dir at " + stagingPath + "@Library/Caches"},
         {"metadata file", is(DiskCall::createFile), once, ErrorCode::propertyListNotWritten,
          "Failed to write metadata dictionary to URL " + stagingPath + "@"},

@@ -190,7 +190,7 @@ TEST(Options, CommandLine) {
         {{"--log-level", ""}, "", 2, "log level '' is not"},
         {{"--log-level", "-1"}, "", 2, "log level '-1' is not"},
         {{"--nonsense"}, "", 2, "unknown option '--nonsense'"},
-        {{"-x"}, "", 2, "unknown option"},
+        {{"-xy"}, "", 2, "unknown option '-x'"},
         {{"start"}, "", 2, "unexpected argument 'start'"},
         {{"--", "start"}, "", 2, "unexpected argument 'start'"},
         {{"--help", "--nonsense"}, "", 0, "Usage: zorvaned"},

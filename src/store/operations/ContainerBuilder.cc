@@ -8,6 +8,7 @@
 
 #include <cstring>
 #include <fcntl.h>
+#include <utility>
 
 namespace zor {
 
@@ -53,9 +54,20 @@ Result<void> ContainerBuilder::_createTopLevelContainerDirectory() {
 Result<void> ContainerBuilder::_createSubDirectories() {
     subdirectories_.reserve(layout_.subdirectories.size());
     for (const char* subdirectory : layout_.subdirectories) {
-        if (const int made = disk_.makeDirectory(directory_.get(), subdirectory, closedMode); made < 0)
+        const char* slash = std::strrchr(subdirectory, '/');
+        FileDescriptor above; // of one that lies below another, which came before it
+        if (slash) {
+            const std::string path(subdirectory, slash);
+            auto opened = openBeneath(directory_.get(), path.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
+            if (!opened)
+                return subdirectoryError(ZOR_HERE, subdirectory, opened.error(), "opendir");
+            above = std::move(*opened);
+        }
+        const int parent = slash ? above.get() : directory_.get();
+        const char* name = slash ? slash + 1 : subdirectory;
+        if (const int made = disk_.makeDirectory(parent, name, closedMode); made < 0)
             return subdirectoryError(ZOR_HERE, subdirectory, -made, "mkdir");
-        auto opened = openBeneath(directory_.get(), subdirectory, O_PATH | O_DIRECTORY | O_NOFOLLOW);
+        auto opened = openBeneath(parent, name, O_PATH | O_DIRECTORY | O_NOFOLLOW);
         if (!opened)
             return subdirectoryError(ZOR_HERE, subdirectory, opened.error(), "opendir");
         subdirectories_.push_back(std::move(*opened));
