@@ -88,7 +88,7 @@ using Bytes = std::span<const std::uint8_t>;
 [[nodiscard]] std::vector<std::uint8_t> encodeRequest(Bytes buffer);
 struct Reply {
     ReturnCode returnCode = ReturnCode::success;
-    Bytes buffer; // in the packet
+    Bytes buffer; // in the packet; empty, too, when the daemon could not send what it had
 };
 /// nullopt for a packet that is no reply to `processContainersMessageId`.
 [[nodiscard]] std::optional<Reply> decodeReply(Bytes packet);
