@@ -4,6 +4,7 @@
 #include "platform/BlockingScope.h"
 
 #include <algorithm>
+#include <sched.h>
 
 namespace zor {
 
@@ -11,6 +12,10 @@ using platform::BlockingScope;
 using platform::MutexLock;
 
 namespace {
+
+/// A lookup is done with the lock in a few microseconds, less than it takes to put a thread to sleep and to wake it. Who
+/// does not get the lock after that many turns waits for something slower.
+constexpr int yieldsMax = 16;
 
 const char* name(LockMode mode) {
     return mode == LockMode::writing ? "writing" : "reading";
@@ -33,6 +38,12 @@ void ZORLocks::unlock_identifier(std::vector<std::string> identifiers) {
     sortOnce(identifiers);
     for (auto identifier = identifiers.rbegin(); identifier != identifiers.rend(); ++identifier)
         unlock_one_lock(*identifier);
+}
+
+void ZORLocks::yield() {
+    mutex_.unlock();
+    ::sched_yield();
+    mutex_.lock();
 }
 
 void ZORLocks::waitForAll(platform::ConditionVariable& condition) {
@@ -117,8 +128,11 @@ void ZORLocks::_lock_all_identifiers(LockMode mode) {
     ZOR_LOG(log_, logLevelDebug, "Waiting to lock all identifiers for %s", name(mode));
     const MutexLock held(mutex_);
     if (mode == LockMode::writing) {
-        while (!everythingIsFree())
-            waitForAll(allWriter_);
+        for (int yielded = 0; !everythingIsFree(); ++yielded)
+            if (yielded < yieldsMax)
+                yield();
+            else
+                waitForAll(allWriter_);
         allReaderWriterState_ = -1;
     } else {
         while (identifierWriterCount_ != 0 || allReaderWriterState_ == -1)

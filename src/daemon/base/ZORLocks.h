@@ -66,6 +66,8 @@ private:
     [[nodiscard]] bool everythingIsFree() const ZOR_REQUIRES(mutex_) {
         return allReaderWriterState_ == 0 && noIdentifierIsLocked();
     }
+    /// Lets others run, without the mutex.
+    void yield() ZOR_REQUIRES(mutex_);
     void waitForAll(platform::ConditionVariable& condition) ZOR_REQUIRES(mutex_);
 
     const Log& log_;
