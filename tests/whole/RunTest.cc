@@ -1,0 +1,446 @@
+// SPDX-License-Identifier: Apache-2.0
+// zorvane-run as a service manager uses it: a real daemon, real containers, real sandboxes. What makes sandboxes needs
+// root, and a kernel that allows namespaces here.
+#include "whole/DaemonProcess.h"
+
+#include <csignal>
+#include <fcntl.h>
+#include <filesystem>
+#include <fstream>
+#include <gtest/gtest.h>
+#include <sstream>
+#include <sys/wait.h>
+#include <thread>
+
+namespace zor::whole {
+
+namespace {
+
+namespace files = std::filesystem;
+using Words = std::vector<std::string>;
+
+const std::string notes = "org.example.notes";
+const std::string maps = "org.example.maps";
+
+std::string contentOf(const std::string& path) {
+    std::ostringstream text;
+    text << std::ifstream(path).rdbuf();
+    return text.str();
+}
+
+void writeFile(const std::string& path, const std::string& text, mode_t mode = 0644) {
+    std::ofstream(path, std::ios::trunc) << text;
+    ::chmod(path.c_str(), mode);
+}
+
+bool waitUntil(const std::function<bool()>& condition) {
+    for (int tries = 0; tries < 1000; ++tries) {
+        if (condition())
+            return true;
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    return false;
+}
+
+/// Why no sandbox can be made here; empty when one can.
+std::string whyNoSandbox() {
+    if (::geteuid() != 0)
+        return "needs root: becomes other users";
+    if (!files::exists("/usr/bin/bwrap"))
+        return "needs bubblewrap";
+    const auto probe = runProgram({"/usr/bin/bwrap", "--unshare-pid", "--unshare-ipc", "--unshare-uts", "--ro-bind",
+                                   "/", "/", "--proc", "/proc", "--dev", "/dev", "true"});
+    return probe.exitStatus == 0 ? "" : "no namespaces here: " + probe.output;
+}
+
+#define ZOR_NEEDS_SANDBOX()                                                                                            \
+    if (const std::string why = whyNoSandbox(); !why.empty())                                                          \
+    GTEST_SKIP() << why
+
+/// A daemon that knows the launcher, and two identifiers of user 501 that share a group.
+class Launcher {
+public:
+    static constexpr const char* agent = "<key>KernelAgent</key><true/><key>Entitlements</key><dict/>";
+
+    explicit Launcher(const std::string& entry = agent) {
+        // A folder that every user can reach, whatever the checkout lies in.
+        program_ = daemon.path("zorvane-run");
+        files::copy_file(programPath("zorvane-run"), program_);
+        writeFile(daemon.path("etc/zorvane/identities.d/30-run.plist"),
+                  "<plist version=\"1.0\"><dict><key>Identifier</key><string>com.veltra.zorvane-run</string>"
+                  "<key>Executable</key><string>" +
+                      program_ + "</string>" + entry + "</dict></plist>");
+        daemon.start();
+        for (const std::string& identifier : {notes, maps})
+            setGroups(identifier, {"group.shared"});
+    }
+
+    void setGroups(const std::string& identifier, const Words& groups, bool systemContainer = false) {
+        zorvane::List list;
+        for (const std::string& group : groups)
+            list.push_back({group});
+        zorvane::Map entitlements = {{"com.veltra.security.application-groups", {std::move(list)}}};
+        if (systemContainer)
+            entitlements["com.veltra.security.system-container"] = {true};
+        ASSERT_TRUE(daemon.client().processEntitlements({.identifier = identifier, .entitlements = entitlements}));
+    }
+    [[nodiscard]] std::string data(const std::string& identifier, std::uint32_t user = 501) const {
+        const auto found = daemon.client().createOrLookup(
+            {.containerClass = 2, .user = user, .identifier = identifier, .create = true});
+        return found ? found->path : "";
+    }
+    [[nodiscard]] std::string group(const std::string& identifier, const std::string& group) const {
+        return daemon.client().groupContainerPaths(501, identifier).value()[group];
+    }
+    [[nodiscard]] Words words(const std::string& identifier, const Words& more) const {
+        Words all = {program_, "--root", daemon.root(), "--identifier", identifier, "--user", "501"};
+        all.insert(all.end(), more.begin(), more.end());
+        return all;
+    }
+    [[nodiscard]] DaemonProcess::Outcome run(const std::string& identifier, const Words& more) const {
+        return runProgram(words(identifier, more));
+    }
+    [[nodiscard]] DaemonProcess::Outcome shell(const std::string& identifier, const std::string& script) const {
+        return run(identifier, {"--", "sh", "-c", script});
+    }
+    [[nodiscard]] const std::string& program() const { return program_; }
+
+    DaemonProcess daemon;
+
+private:
+    std::string program_;
+};
+
+/// The launcher in the background; its output goes to a file.
+class Background {
+public:
+    Background(const Words& words, const std::string& output) {
+        std::vector<char*> pointers;
+        for (const std::string& word : words)
+            pointers.push_back(const_cast<char*>(word.c_str()));
+        pointers.push_back(nullptr);
+        pid_ = ::fork();
+        if (pid_ == 0) {
+            const int file = ::open(output.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+            ::dup2(file, 1);
+            ::execv(pointers[0], pointers.data());
+            ::_exit(127);
+        }
+    }
+    ~Background() {
+        if (pid_ > 0) {
+            ::kill(pid_, SIGKILL);
+            (void)end();
+        }
+    }
+    Background(const Background&) = delete;
+    Background& operator=(const Background&) = delete;
+    [[nodiscard]] pid_t pid() const { return pid_; }
+    int end() {
+        int status = 0;
+        ::waitpid(std::exchange(pid_, -1), &status, 0);
+        return WIFEXITED(status) ? WEXITSTATUS(status) : -WTERMSIG(status);
+    }
+
+private:
+    pid_t pid_ = -1;
+};
+
+} // namespace
+
+// Goal: whatever keeps a program from being run is 125 and says what to do. Method: a table of command lines, the last
+// of them against a root without a daemon.
+TEST(Run, CommandLines) {
+    const support::TemporaryDirectory empty;
+    const Words whole = {"--identifier", "a.b", "--user", "501"};
+    struct Row {
+        Words words;
+        int exitCode;
+        const char* says;
+    };
+    const Row rows[] = {
+        {{"--help"}, 0, "Examples:"},
+        {{"--version"}, 0, "zorvane-run "},
+        {{}, 125, "--identifier is missing"},
+        {{"--identifier", "", "--user", "501", "sh"}, 125, "--identifier is missing"},
+        {{"--identifier", "a.b", "sh"}, 125, "--user is missing"},
+        {{"--identifier", "a.b", "--user", "0", "sh"}, 125, "'0' is no user"},
+        {{"--identifier", "a.b", "--user", "1", "sh"}, 125, "'1' is no user"},
+        {{"--identifier", "a.b", "--user", "501x", "sh"}, 125, "'501x' is no user"},
+        {{"--identifier", "a.b", "--user", "4294967295", "sh"}, 125, "is no user"},
+        {{"--identifier", "a.b", "--user", "4294967797", "sh"}, 125, "is no user"},
+        {{"--identifier", "a.b", "--user", "501", "--"}, 125, "no program"},
+        {{"--identifier", "a.b", "--user", "501", ""}, 125, "no program"},
+        {{"--identifier", "a.b", "--user"}, 125, "needs a value"},
+        {{"--nothing", "sh"}, 125, "is no option"},
+        {{"--inside"}, 125, "itself"},
+        {{"--inside", "0", "0", "/", "sh"}, 125, "itself"},
+        {{"--identifier", "a.b", "--user", "501", "--root", "/nowhere", "sh"}, 125, "What to do: "},
+        {{"--identifier", "a.b", "--user", "501", "--root", empty.path(), "sh", "--user"}, 125, "What to do: "},
+    };
+    for (const Row& row : rows) {
+        Words words = {programPath("zorvane-run")};
+        words.insert(words.end(), row.words.begin(), row.words.end());
+        const auto outcome = runProgram(words);
+        EXPECT_EQ(outcome.exitStatus, row.exitCode) << outcome.output;
+        EXPECT_NE(outcome.output.find(row.says), std::string::npos) << row.says << " in " << outcome.output;
+    }
+    if (::geteuid() == 0) {
+        Launcher launcher;
+        Words words = {"/usr/bin/setpriv", "--reuid", "501", "--clear-groups"};
+        const Words mine = launcher.words(notes, {"sh"});
+        words.insert(words.end(), mine.begin(), mine.end());
+        const auto outcome = runProgram(words);
+        EXPECT_EQ(outcome.exitStatus, 125) << outcome.output;
+        EXPECT_NE(outcome.output.find("needs root"), std::string::npos) << outcome.output;
+    }
+}
+
+// Goal: a program finds its own containers, can write there, and nothing else of anybody. Method: a script inside asks;
+// each line of the table is a condition that has to hold there.
+TEST(Run, ItsOwnContainersAndNothingElse) {
+    ZOR_NEEDS_SANDBOX();
+    Launcher launcher;
+    launcher.setGroups(notes, {"group.shared"}, true);
+    launcher.setGroups(maps, {"group.shared", "group.maps"});
+    const std::string home = launcher.data(notes);
+    const std::string shared = launcher.group(notes, "group.shared");
+    const std::string root = launcher.daemon.root();
+    writeFile(launcher.data(maps) + "/secret", "secret", 0666);
+    const std::string system = *launcher.daemon.client().systemContainerPath(notes);
+    const std::string conditions[] = {
+        "test \"$HOME\" = " + home,
+        "test \"$(pwd)\" = " + home,
+        "test \"$TMPDIR\" = " + home + "/tmp",
+        "test \"$ZORVANE_IDENTIFIER\" = " + notes,
+        "test \"$ZORVANE_SYSTEM_CONTAINER\" = " + system,
+        "test \"$ZORVANE_APP_GROUPS\" = \"$(printf 'group.shared\\t" + shared + "')\"",
+        "echo mine > $HOME/Documents/mine",
+        "touch $TMPDIR/scratch",
+        "echo ours > " + shared + "/Library/ours",
+        "touch " + system + "/Library/mine",
+        "touch /tmp/x && touch /dev/shm/x",
+        "test ! -w $HOME/.com.veltra.zorvane.metadata.plist",
+        "! touch /usr/x && ! touch /etc/x && ! touch /x && ! touch " + root + "/x",
+        // Others' containers, and the way to them.
+        "! cat " + launcher.data(maps) + "/secret",
+        "! ls " + launcher.group(maps, "group.maps"),
+        "! ls " + launcher.data(notes, 502),
+        "test \"$(ls -A " + root + "/private/var/mobile/Containers/Data/Application)\" = \"${HOME##*/}\"",
+        "test \"$(ls -A " + root + "/private/var/mobile/Containers/Shared/AppGroup)\" = \"" +
+            files::path(shared).filename().string() + "\"",
+        "! ls " + root + "/private/var/second && ! ls " + root + "/etc && ! ls " + root + "/run",
+        "! ls /home && ! ls /root && ! ls /var && ! ls /run && ! ls /sys",
+        "! ls /proc/1/root/ && ! ls /proc/1/cwd/",
+        // What it is.
+        "grep -qx 'Uid:\t501\t501\t501\t501' /proc/self/status",
+        "grep -qx 'Gid:\t501\t501\t501\t501' /proc/self/status",
+        "grep -qx 'Groups:\t *' /proc/self/status",
+        "grep -qx 'NoNewPrivs:\t1' /proc/self/status",
+        "test \"$(grep -c '^Cap.*:\t0000000000000000$' /proc/self/status)\" = 5",
+        "grep -qx 'SigBlk:\t0000000000000000' /proc/self/status",
+        "test -z \"$ZORVANE_TEST_SECRET\" && test \"$LC_ALL\" = C.UTF-8",
+        // Of descriptors, the shell has the three; the fourth is what ls reads with.
+        "test \"$(ls /proc/self/fd | tr '\\n' ' ')\" = '0 1 2 3 '",
+        "test $(ls -d /proc/[0-9]* | wc -l) -le 6",
+    };
+    ::setenv("ZORVANE_TEST_SECRET", "secret", 1);
+    ::setenv("LC_ALL", "C.UTF-8", 1);
+    const int inherited = ::open("/", O_PATH | O_DIRECTORY); // a way out, were it passed on
+    std::string script;
+    for (std::size_t i = 0; i < std::size(conditions); ++i)
+        script += "{ " + conditions[i] + "; } >$TMPDIR/out 2>&1 || echo failed " + std::to_string(i) + "\n";
+    for (const char* space : {"pid", "ipc", "mnt", "uts"}) {
+        const std::string link = std::string("/proc/self/ns/") + space;
+        script += "test \"$(readlink " + link + ")\" != '" + files::read_symlink(link).string() + "' || echo shares " +
+                  space + "\n";
+    }
+    const auto outcome = launcher.shell(notes, script + "exit 0");
+    ::close(inherited);
+    ::unsetenv("ZORVANE_TEST_SECRET");
+    EXPECT_EQ(outcome.exitStatus, 0);
+    EXPECT_EQ(outcome.output, "");
+    std::istringstream lines(outcome.output);
+    for (std::string word; lines >> word;)
+        if (std::size_t index = 0; word == "failed" && lines >> index)
+            ADD_FAILURE() << conditions[index];
+    EXPECT_EQ(contentOf(home + "/Documents/mine"), "mine\n");
+    EXPECT_EQ(contentOf(shared + "/Library/ours"), "ours\n");
+    // The other one shares the group, and nothing more.
+    EXPECT_EQ(launcher.shell(maps, "cat " + shared + "/Library/ours").output, "ours\n");
+    EXPECT_NE(launcher.shell(maps, "cat " + home + "/Documents/mine").exitStatus, 0);
+}
+
+// Goal: the exit code and the signals are the program's own, and it does not outlive the launcher. Method: a table of
+// ends; then real signals to the launcher, while the program waits for them.
+TEST(Run, ExitCodesAndSignals) {
+    ZOR_NEEDS_SANDBOX();
+    Launcher launcher;
+    struct Row {
+        Words words;
+        int exitCode;
+    };
+    const std::string notExecutable = "/etc/passwd";
+    const Row rows[] = {
+        {{"--", "true"}, 0},
+        {{"sh", "-c", "exit 7"}, 7},
+        {{"--", "sh", "-c", "exit 125"}, 125},
+        {{"--", "sh", "-c", "kill -TERM $$"}, 128 + SIGTERM},
+        {{"--", "sh", "-c", "kill -KILL $$"}, 128 + SIGKILL},
+        {{"--", "no-such-program"}, 127},
+        {{"--", "/no/such/program"}, 127},
+        {{"--", notExecutable}, 126},
+        {{"--", "/usr"}, 126},
+        {{"--bubblewrap", "/nowhere", "--", "true"}, 125},
+        {{"--bubblewrap", "/bin/false", "--", "true"}, 125},
+        {{"--bubblewrap", "/bin/true", "--", "true"}, 125},
+    };
+    for (const Row& row : rows) {
+        const auto outcome = launcher.run(notes, row.words);
+        EXPECT_EQ(outcome.exitStatus, row.exitCode) << row.words.back() << ": " << outcome.output;
+    }
+    const std::string ready = launcher.data(notes) + "/ready";
+    const std::string output = launcher.daemon.path("output");
+    const std::string wait = "touch $HOME/ready; while :; do sleep 0.02; done";
+    struct Signal {
+        int number;
+        std::string script;
+        int exitCode;
+        const char* says;
+    };
+    const Signal signals[] = {
+        {SIGTERM, "trap 'echo term; exit 3' TERM; ", 3, "term\n"},
+        {SIGINT, "trap 'echo int; exit 4' INT; ", 4, "int\n"},
+        {SIGUSR1, "trap 'echo usr1; exit 5' USR1; ", 5, "usr1\n"},
+        {SIGTERM, "", 128 + SIGTERM, ""},
+        {SIGHUP, "", 128 + SIGHUP, ""},
+    };
+    for (const Signal& signal : signals) {
+        files::remove(ready);
+        Background run(launcher.words(notes, {"--", "sh", "-c", signal.script + wait}), output);
+        ASSERT_TRUE(waitUntil([&] { return files::exists(ready); }));
+        ::kill(run.pid(), signal.number);
+        EXPECT_EQ(run.end(), signal.exitCode) << signal.number;
+        EXPECT_EQ(contentOf(output), signal.says);
+    }
+    // A lock that only the program holds is free again when the launcher was killed.
+    files::remove(ready);
+    Background run(launcher.words(notes, {"--", "sh", "-c", "exec 9>$HOME/held; flock 9; " + wait}), output);
+    ASSERT_TRUE(waitUntil([&] { return files::exists(ready); }));
+    const std::string held = launcher.data(notes) + "/held";
+    ASSERT_NE(runProgram({"/usr/bin/flock", "-n", held, "true"}).exitStatus, 0);
+    ::kill(run.pid(), SIGKILL);
+    EXPECT_EQ(run.end(), -SIGKILL);
+    EXPECT_TRUE(waitUntil([&] { return runProgram({"/usr/bin/flock", "-n", held, "true"}).exitStatus == 0; }));
+}
+
+// Goal: nothing is used that is not registered, and the error says how to register it. Method: a table of choices, the
+// mounts of each as a dry run tells them.
+TEST(Run, OnlyWhatIsRegistered) {
+    if (::geteuid() != 0)
+        GTEST_SKIP() << "needs root";
+    Launcher launcher;
+    launcher.setGroups(notes, {"group.a", "group.b"}, true);
+    struct Row {
+        std::string identifier;
+        Words words;
+        int exitCode;
+        Words says;
+        Words saysNot;
+    };
+    const Row rows[] = {
+        {notes, {}, 0, {"group.a", "group.b", "/Data/System/", "/Data/Application/"}, {"group.shared"}},
+        {notes, {"--app-group", "group.b"}, 0, {"group.b", "/Data/System/"}, {"group.a"}},
+        {notes, {"--system-container", notes}, 0, {"/Data/System/"}, {}},
+        {notes,
+         {"--app-group", "group.shared"},
+         125,
+         {"group.shared is no application group", "entitlements set " + notes + " --app-group group.shared"},
+         {}},
+        {notes, {"--system-group", "systemgroup.x"}, 125, {"no system group", "--system-group systemgroup.x"}, {}},
+        {notes, {"--system-container", maps}, 125, {"cannot be given"}, {}},
+        {maps, {"--system-container", maps}, 125, {"entitlements set " + maps + " --system-container"}, {}},
+        {maps, {}, 0, {"group.shared"}, {"/Data/System/"}},
+        {"org.example.unknown", {}, 0, {"/Data/Application/"}, {"/Shared/", "/Data/System/"}},
+    };
+    for (const Row& row : rows) {
+        for (const char* form : {"--dry-run", "--json"}) {
+            Words words = row.words;
+            words.insert(words.end(), {"--dry-run", form, "--", "no-such-program"});
+            const auto outcome = launcher.run(row.identifier, words);
+            EXPECT_EQ(outcome.exitStatus, row.exitCode) << outcome.output;
+            for (const std::string& text : row.says)
+                EXPECT_NE(outcome.output.find(text), std::string::npos) << text << " in " << outcome.output;
+            for (const std::string& text : row.saysNot)
+                EXPECT_EQ(outcome.output.find(text), std::string::npos) << text << " in " << outcome.output;
+        }
+    }
+    // Asking has not made containers that nothing refers to.
+    EXPECT_TRUE(launcher.daemon.client().list(7, 501, false).value().size() == 3);
+    EXPECT_EQ(launcher.daemon.client().list(12, 499, false).value().size(), 1U);
+    EXPECT_EQ(launcher.daemon.client().list(13, 499, false).value().size(), 0U);
+}
+
+// Goal: a launcher that the daemon does not know, or not as the kernel's agent, is told so. Method: registry entries.
+TEST(Run, TheDaemonHasToKnowTheLauncher) {
+    if (::geteuid() != 0)
+        GTEST_SKIP() << "needs root";
+    const std::pair<const char*, const char*> rows[] = {
+        {"<key>KernelAgent</key><true/>", "register this program"},
+        {"<key>Entitlements</key><dict/>", "KernelAgent"},
+        {"<key>KernelAgent</key><true/><key>Entitlements</key><dict/><key>UserIDs</key><array><integer>7</integer>"
+         "</array>",
+         "register this program"},
+    };
+    for (const auto& [entry, says] : rows) {
+        const Launcher launcher(entry);
+        const auto outcome = launcher.run(notes, {"--", "true"});
+        EXPECT_EQ(outcome.exitStatus, 125);
+        EXPECT_NE(outcome.output.find(says), std::string::npos) << outcome.output;
+    }
+}
+
+// Goal: what is mounted is the container that was checked, even when its name leads elsewhere by then. Method: a maker
+// of sandboxes that swaps the container for a link, or another directory, before it does its work.
+TEST(Run, AContainerSwappedAfterTheCheck) {
+    ZOR_NEEDS_SANDBOX();
+    for (const char* swap : {"ln -s DIR/elsewhere", "mv DIR/elsewhere"}) {
+        Launcher launcher;
+        const std::string home = launcher.data(notes);
+        const std::string elsewhere = launcher.daemon.path("elsewhere");
+        files::create_directory(elsewhere);
+        ASSERT_EQ(::chown(elsewhere.c_str(), 501, 501), 0);
+        writeFile(elsewhere + "/which", "elsewhere");
+        writeFile(home + "/which", "container");
+        std::string put = swap;
+        put.replace(put.find("DIR"), 3, launcher.daemon.root());
+        const std::string maker = launcher.daemon.path("maker");
+        writeFile(maker,
+                  "#!/bin/sh\nmv '" + home + "' '" + home + ".old' && " + put + " '" + home +
+                      "' || exit 1\nexec /usr/bin/bwrap \"$@\"\n",
+                  0755);
+        const auto outcome = launcher.run(notes, {"--bubblewrap", maker, "--", "cat", home + "/which"});
+        EXPECT_EQ(outcome.output, "container") << swap;
+        EXPECT_EQ(contentOf(home + "/which"), "elsewhere") << "the swap took place";
+    }
+}
+
+// Goal: a directory to read is there, and only to read; the daemon's socket is such a one, so that a program can be a
+// client. Method: a program that lies in one, and the tool.
+TEST(Run, DirectoriesToRead) {
+    ZOR_NEEDS_SANDBOX();
+    Launcher launcher;
+    const std::string code = launcher.daemon.path("opt");
+    files::create_directory(code);
+    writeFile(code + "/program", "#!/bin/sh\necho \"$@\"; touch " + code + "/x 2>/dev/null && echo written\n", 0755);
+    const auto outcome = launcher.run(notes, {"--read-only", code, "--", code + "/program", "--user", "1"});
+    EXPECT_EQ(outcome.exitStatus, 1);
+    EXPECT_EQ(outcome.output, "--user 1\n");
+    files::copy_file(programPath("zorvanectl"), code + "/zorvanectl");
+    const auto status = launcher.run(notes, {"--read-only", code, "--read-only", launcher.daemon.path("run/zorvane"),
+                                             "--", code + "/zorvanectl", "--root", launcher.daemon.root(), "status"});
+    EXPECT_EQ(status.exitStatus, 0) << status.output;
+    EXPECT_NE(status.output.find("EffectiveUserID: 501"), std::string::npos) << status.output;
+}
+
+} // namespace zor::whole

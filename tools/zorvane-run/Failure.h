@@ -1,0 +1,30 @@
+// SPDX-License-Identifier: Apache-2.0
+// Why this program could not start another one: what happened and where, and what to do about it.
+#pragma once
+
+#include <expected>
+#include <string>
+
+namespace zorvanerun {
+
+struct Failure {
+    /// One sentence for people, without a full stop.
+    std::string what;
+    std::string advice;
+};
+
+template <typename T>
+using Result = std::expected<T, Failure>;
+
+/// "WHAT: what the errno means".
+[[nodiscard]] std::string withReason(const std::string& what, int number);
+/// Control characters shown as \xNN, so that a name cannot steer the terminal.
+[[nodiscard]] std::string printable(const std::string& text);
+
+// Exit codes of the program's own; any other is that of the program it ran, 128 and the number for a signal.
+inline constexpr int exitDone = 0;
+inline constexpr int exitFailure = 125;
+inline constexpr int exitCannotExecute = 126;
+inline constexpr int exitNotFound = 127;
+
+} // namespace zorvanerun

@@ -1,0 +1,107 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "Inside.h"
+
+#include "Descriptors.h"
+#include "Failure.h"
+
+#include <cerrno>
+#include <charconv>
+#include <csignal>
+#include <cstdint>
+#include <cstdio>
+#include <cstring>
+#include <fcntl.h>
+#include <grp.h>
+#include <linux/capability.h>
+#include <sys/prctl.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+namespace zorvanerun {
+
+namespace {
+
+enum Argument : int { optionAt = 1, channelAt, userAt, directoryAt, programAt };
+
+int say(const std::string& what, int exitCode) {
+    std::fprintf(stderr, "zorvane-run: %s\n", printable(what).c_str());
+    return exitCode;
+}
+
+template <typename Number>
+bool parse(const char* text, Number& number) {
+    const char* const end = text + std::strlen(text);
+    const auto [last, error] = std::from_chars(text, end, number);
+    return error == std::errc() && last == end;
+}
+
+/// Every set of them that a process has, of every capability that the kernel knows.
+bool dropCapabilities() {
+    __user_cap_header_struct header{.version = _LINUX_CAPABILITY_VERSION_3, .pid = 0};
+    const __user_cap_data_struct none[_LINUX_CAPABILITY_U32S_3] = {};
+    return ::prctl(PR_CAP_AMBIENT, PR_CAP_AMBIENT_CLEAR_ALL, 0, 0, 0) == 0 && ::syscall(SYS_capset, &header, none) == 0;
+}
+
+bool dropBoundingSet() {
+    for (unsigned long capability = 0; ::prctl(PR_CAPBSET_READ, capability, 0, 0, 0) >= 0; ++capability)
+        if (::prctl(PR_CAPBSET_DROP, capability, 0, 0, 0) != 0)
+            return false;
+    return true;
+}
+
+bool hasNothingLeft(uid_t user) {
+    uid_t userIds[3] = {};
+    gid_t groupIds[3] = {};
+    if (::getresuid(&userIds[0], &userIds[1], &userIds[2]) != 0 ||
+        ::getresgid(&groupIds[0], &groupIds[1], &groupIds[2]) != 0 || ::getgroups(0, nullptr) != 0)
+        return false;
+    for (int i = 0; i < 3; ++i)
+        if (userIds[i] != user || groupIds[i] != user)
+            return false;
+    __user_cap_header_struct header{.version = _LINUX_CAPABILITY_VERSION_3, .pid = 0};
+    __user_cap_data_struct data[_LINUX_CAPABILITY_U32S_3] = {};
+    if (::syscall(SYS_capget, &header, data) != 0)
+        return false;
+    for (const __user_cap_data_struct& part : data)
+        if (part.effective != 0 || part.permitted != 0 || part.inheritable != 0)
+            return false;
+    return ::prctl(PR_GET_NO_NEW_PRIVS, 0, 0, 0, 0) == 1 && ::setresuid(0, 0, 0) != 0;
+}
+
+/// In this order: each step needs a power that a later one takes away. Judged by what is left, not by what was called.
+bool become(uid_t user) {
+    return ::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) == 0 && ::prctl(PR_SET_KEEPCAPS, 0, 0, 0, 0) == 0 &&
+           dropBoundingSet() && ::setgroups(0, nullptr) == 0 && ::setresgid(user, user, user) == 0 &&
+           ::setresuid(user, user, user) == 0 && dropCapabilities() && hasNothingLeft(user);
+}
+
+} // namespace
+
+int runInside(int argumentCount, char** arguments) {
+    int channel = -1;
+    std::uint32_t user = 0;
+    if (argumentCount <= Argument::programAt || !parse(arguments[Argument::channelAt], channel) || channel < 0 ||
+        !parse(arguments[Argument::userAt], user) || user == 0)
+        return say("the option is for the use of zorvane-run itself", exitFailure);
+    if (!become(user))
+        return say(withReason("cannot become user " + std::to_string(user), errno), exitFailure);
+    // As the user: a container may be closed to everybody else.
+    const char* const directory = arguments[Argument::directoryAt];
+    if (::chdir(directory) != 0)
+        return say(withReason("cannot go to " + std::string(directory), errno), exitFailure);
+    sigset_t none;
+    ::sigemptyset(&none);
+    ::sigprocmask(SIG_SETMASK, &none, nullptr);
+    const zor::platform::FileDescriptor self(static_cast<int>(::syscall(SYS_pidfd_open, ::getpid(), 0)));
+    if (!self.valid() || !sendDescriptor(channel, self.get()))
+        return say(withReason("cannot report", errno), exitFailure);
+    if (!closeOnExecFrom(STDERR_FILENO + 1))
+        return say(withReason("cannot close descriptors", errno), exitFailure);
+    char** const program = arguments + Argument::programAt;
+    ::execvp(program[0], program);
+    const int number = errno;
+    return say(withReason("cannot execute " + std::string(program[0]), number),
+               number == ENOENT || number == ENOTDIR ? exitNotFound : exitCannotExecute);
+}
+
+} // namespace zorvanerun

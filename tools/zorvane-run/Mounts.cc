@@ -1,0 +1,191 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "Mounts.h"
+
+#include "platform/linux/Openat2.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <climits>
+#include <fcntl.h>
+#include <sys/stat.h>
+
+namespace zorvanerun {
+
+using zor::platform::FileDescriptor;
+using zor::platform::openBeneath;
+
+namespace {
+
+/// What is shown of the system, where it is there. Where /usr holds everything, most of these are links into it.
+constexpr const char* systemDirectories[] = {"/usr", "/bin", "/sbin", "/lib", "/lib32", "/lib64", "/libx32", "/etc"};
+/// Places that the sandbox fills itself.
+constexpr const char* ownDirectories[] = {"/proc", "/dev", "/tmp"};
+
+// The system's containers are the daemon's; those that an older system made belong to the user that owns them by name.
+constexpr uid_t rootUser = 0;
+constexpr uid_t systemUser = 499;
+
+std::unexpected<Failure> failed(std::string what, std::string advice) {
+    return std::unexpected(Failure{.what = std::move(what), .advice = std::move(advice)});
+}
+
+Result<FileDescriptor> openPlain(const Root& root, const std::string& path, const std::string& what,
+                                 const std::string& advice) {
+    const std::string relative = path.substr(root.path == "/" ? 1 : root.path.size() + 1);
+    auto opened = openBeneath(root.descriptor.get(), relative.c_str(), O_PATH | O_DIRECTORY);
+    if (opened)
+        return std::move(*opened);
+    if (opened.error() == ELOOP)
+        return failed(what + " " + path + " is a symbolic link, or lies behind one", advice);
+    return failed(withReason(what + " " + path + " cannot be opened", opened.error()), advice);
+}
+
+class Collector {
+public:
+    Collector(const Root& root, const Options& options, std::vector<Mount>& mounts)
+        : root_(root), options_(options), mounts_(mounts) {}
+
+    Result<void> container(Mount::Kind kind, const std::string& identifier, const std::string& path) {
+        const std::string what = "the " + std::string(kindName(kind)) + " container of " + identifier;
+        for (const char* directory : systemDirectories)
+            if (isAtOrBelow(path, directory))
+                return failed(what + " " + path + " lies in " + directory + ", which every program sees",
+                              "give the daemon a root elsewhere");
+        const std::string advice =
+            "somebody has changed the directory: look who can write to the one that holds it, put "
+            "the container back, or delete it with zorvanectl";
+        auto directory = openPlain(root_, path, what, advice);
+        if (!directory)
+            return std::unexpected(directory.error());
+        struct stat status{};
+        if (::fstat(directory->get(), &status) != 0)
+            return failed(withReason(what + " " + path + " cannot be read", errno), advice);
+        const bool users = kind == Mount::Kind::data || kind == Mount::Kind::applicationGroup;
+        const bool owned =
+            users ? status.st_uid == options_.user : status.st_uid == rootUser || status.st_uid == systemUser;
+        if (!S_ISDIR(status.st_mode) || !owned)
+            return failed(what + " " + path + " belongs to user " + std::to_string(status.st_uid) + ", not to " +
+                              (users ? "user " + std::to_string(options_.user) : "the system"),
+                          advice);
+        mounts_.push_back({.kind = kind,
+                           .identifier = identifier,
+                           .path = path,
+                           .descriptor = std::move(*directory),
+                           .linkTarget = {}});
+        return {};
+    }
+
+    Result<void> groups(Mount::Kind kind, const std::map<std::string, std::string>& groups) {
+        for (const auto& [identifier, path] : groups)
+            if (auto added = container(kind, identifier, path); !added)
+                return added;
+        return {};
+    }
+
+    Result<void> readOnly(const Root& device, const std::string& path, const std::vector<std::string>& containers) {
+        const std::string advice = "name a directory by its real, absolute path; not one that holds containers or what "
+                                   "the sandbox has anyway";
+        bool clashes = !isPlainPath(path);
+        for (const std::string& container : containers)
+            clashes = clashes || isAtOrBelow(container, path) || isAtOrBelow(path, container);
+        for (const char* directory : ownDirectories)
+            clashes = clashes || isAtOrBelow(directory, path);
+        for (const char* directory : systemDirectories)
+            clashes = clashes || isAtOrBelow(path, directory);
+        if (clashes)
+            return failed(path + " cannot be shown read-only", advice);
+        auto directory = openPlain(device, path, "the directory", advice);
+        if (!directory)
+            return std::unexpected(directory.error());
+        mounts_.push_back({.kind = Mount::Kind::readOnly,
+                           .identifier = {},
+                           .path = path,
+                           .descriptor = std::move(*directory),
+                           .linkTarget = {}});
+        return {};
+    }
+
+    Result<void> operatingSystem(const Root& device) {
+        for (const char* const path : systemDirectories) {
+            struct stat status{};
+            if (::fstatat(device.descriptor.get(), path + 1, &status, AT_SYMLINK_NOFOLLOW) != 0)
+                continue;
+            Mount mount{
+                .kind = Mount::Kind::system, .identifier = {}, .path = path, .descriptor = {}, .linkTarget = {}};
+            if (S_ISLNK(status.st_mode)) {
+                char target[PATH_MAX];
+                const ssize_t length = ::readlinkat(device.descriptor.get(), path + 1, target, sizeof target);
+                mount.linkTarget.assign(target, static_cast<std::size_t>(std::max<ssize_t>(length, 0)));
+            } else {
+                auto directory = openPlain(device, path, "the directory", "see what stands in its place");
+                if (!directory)
+                    return std::unexpected(directory.error());
+                mount.descriptor = std::move(*directory);
+            }
+            mounts_.push_back(std::move(mount));
+        }
+        return {};
+    }
+
+private:
+    const Root& root_;
+    const Options& options_;
+    std::vector<Mount>& mounts_;
+};
+
+std::vector<std::string> pathsOf(const ToldContainers& told) {
+    std::vector<std::string> paths = {told.data};
+    for (const auto* groups : {&told.applicationGroups, &told.systemGroups})
+        for (const auto& [identifier, path] : *groups)
+            paths.push_back(path);
+    if (told.systemContainer)
+        paths.push_back(*told.systemContainer);
+    return paths;
+}
+
+} // namespace
+
+const char* kindName(Mount::Kind kind) {
+    switch (kind) {
+    case Mount::Kind::data:
+        return "data";
+    case Mount::Kind::applicationGroup:
+        return "application-group";
+    case Mount::Kind::systemContainer:
+        return "system";
+    case Mount::Kind::systemGroup:
+        return "system-group";
+    case Mount::Kind::readOnly:
+        return "read-only";
+    case Mount::Kind::system:
+        break;
+    }
+    return "operating-system";
+}
+
+Result<std::vector<Mount>> openMounts(const Root& root, const Options& options, const ToldContainers& told) {
+    // The system is the one that this program runs on, whatever root the daemon has.
+    const auto device = Root::open("/");
+    if (!device)
+        return std::unexpected(device.error());
+    std::vector<Mount> mounts;
+    Collector collector(root, options, mounts);
+    Result<void> done = collector.operatingSystem(*device);
+    const std::vector<std::string> containers = pathsOf(told);
+    for (const std::string& path : options.readOnly)
+        if (done)
+            done = collector.readOnly(*device, path, containers);
+    if (done)
+        done = collector.container(Mount::Kind::data, options.identifier, told.data);
+    if (done)
+        done = collector.groups(Mount::Kind::applicationGroup, told.applicationGroups);
+    if (done && told.systemContainer)
+        done = collector.container(Mount::Kind::systemContainer, options.identifier, *told.systemContainer);
+    if (done)
+        done = collector.groups(Mount::Kind::systemGroup, told.systemGroups);
+    if (!done)
+        return std::unexpected(done.error());
+    return mounts;
+}
+
+} // namespace zorvanerun

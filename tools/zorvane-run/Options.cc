@@ -1,0 +1,166 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "Options.h"
+
+#include "Failure.h"
+
+#include <charconv>
+#include <cstring>
+#include <getopt.h>
+
+namespace zorvanerun {
+
+namespace {
+
+constexpr const char* help =
+    R"(Usage: zorvane-run [OPTION]... --identifier ID --user N [--] PROGRAM [ARGUMENT]...
+
+Runs a program as user N in a sandbox that holds the containers of its identifier,
+a read-only system, and nothing else of any user. What is missing is made.
+
+  --identifier ID        whose containers: data, groups, system
+  --user N               user id (and group id) that the program runs with
+  --app-group G          this application group, and no other; may repeat
+  --system-group G       this system group, and no other; may repeat
+  --system-container ID  fail unless ID, which is the identifier, owns a system container
+  --read-only DIR        show DIR too, read-only: the program's own files; may repeat
+  --root DIR             system root of the daemon (default /)
+  --bubblewrap FILE      the program that makes the sandbox (default /usr/bin/bwrap)
+  --dry-run              say what would be mounted, run nothing
+  --json                 the same, and errors, as JSON
+  --help, --version
+
+Without a group named, all those registered for the identifier are there; one that is
+named has to be registered ('zorvanectl entitlements set'), since the next boot deletes
+containers that nothing registered refers to. The same holds for the system container.
+
+The program finds HOME (its data container), TMPDIR (in it), ZORVANE_IDENTIFIER,
+ZORVANE_SYSTEM_CONTAINER (a path, where there is one), and ZORVANE_APP_GROUPS and
+ZORVANE_SYSTEM_GROUPS (a line for each: group, tab, path). Of the caller's environment
+it gets LANG, LANGUAGE, LC_*, TERM and TZ; use env(1) for more.
+
+Examples:
+  zorvane-run --identifier org.example.notes --user 501 -- /usr/bin/notes --new
+  zorvane-run --identifier org.example.notes --user 501 --read-only /opt/notes \
+      -- env DEBUG=1 /opt/notes/bin/notes
+  zorvane-run --identifier org.example.notes --user 501 --dry-run -- notes
+
+Exit codes: that of the program, 128+n when signal n ended it; 125 when zorvane-run
+failed, 126 when the program cannot be executed, 127 when it is not found. HUP, INT,
+QUIT, TERM, USR1 and USR2 are passed on to the program. It needs root; see
+zorvane-run(8) for how the daemon gets to know it.
+)";
+
+constexpr std::uint32_t rootUser = 0;
+constexpr std::uint32_t currentUserPlaceholder = 1;
+
+OptionsEnd usage(const std::string& what) {
+    return {.text = "zorvane-run: " + printable(what) + "\n  What to do: see 'zorvane-run --help'.\n",
+            .exitCode = exitFailure};
+}
+
+/// A user that a program may become.
+bool parseUser(const char* text, std::uint32_t& user) {
+    const char* const end = text + std::strlen(text);
+    const auto [last, error] = std::from_chars(text, end, user);
+    // The largest number is what the kernel takes for "leave it as it is".
+    return error == std::errc() && last == end && user != rootUser && user != currentUserPlaceholder &&
+           user != UINT32_MAX;
+}
+
+enum Option : int {
+    root = 1,
+    identifier,
+    user,
+    appGroup,
+    systemGroup,
+    systemContainer,
+    readOnly,
+    bubblewrap,
+    dryRun,
+    json,
+    helpText,
+    version
+};
+
+constexpr option known[] = {
+    {"root", required_argument, nullptr, Option::root},
+    {"identifier", required_argument, nullptr, Option::identifier},
+    {"user", required_argument, nullptr, Option::user},
+    {"app-group", required_argument, nullptr, Option::appGroup},
+    {"system-group", required_argument, nullptr, Option::systemGroup},
+    {"system-container", required_argument, nullptr, Option::systemContainer},
+    {"read-only", required_argument, nullptr, Option::readOnly},
+    {"bubblewrap", required_argument, nullptr, Option::bubblewrap},
+    {"dry-run", no_argument, nullptr, Option::dryRun},
+    {"json", no_argument, nullptr, Option::json},
+    {"help", no_argument, nullptr, Option::helpText},
+    {"version", no_argument, nullptr, Option::version},
+    {nullptr, 0, nullptr, 0},
+};
+
+/// nullopt when the option is taken, else how parsing ends.
+std::optional<OptionsEnd> take(int option, const char* value, const char* argument, Options& options) {
+    switch (option) {
+    case Option::root:
+        options.root = value;
+        return std::nullopt;
+    case Option::identifier:
+        options.identifier = value;
+        return std::nullopt;
+    case Option::user:
+        if (parseUser(value, options.user))
+            return std::nullopt;
+        return usage("'" + std::string(value) + "' is no user that a program can be run as");
+    case Option::appGroup:
+        options.applicationGroups.emplace_back(value);
+        return std::nullopt;
+    case Option::systemGroup:
+        options.systemGroups.emplace_back(value);
+        return std::nullopt;
+    case Option::systemContainer:
+        options.systemContainer = value;
+        return std::nullopt;
+    case Option::readOnly:
+        options.readOnly.emplace_back(value);
+        return std::nullopt;
+    case Option::bubblewrap:
+        options.bubblewrap = value;
+        return std::nullopt;
+    case Option::dryRun:
+        options.dryRun = true;
+        return std::nullopt;
+    case Option::json:
+        options.json = true;
+        return std::nullopt;
+    case Option::helpText:
+        return OptionsEnd{.text = help, .exitCode = exitDone};
+    case Option::version:
+        return OptionsEnd{.text = "zorvane-run " ZORVANE_VERSION "\n", .exitCode = exitDone};
+    case ':':
+        return usage("option '" + std::string(argument) + "' needs a value");
+    default:
+        return usage("'" + std::string(argument) + "' is no option");
+    }
+}
+
+} // namespace
+
+std::expected<Options, OptionsEnd> parseOptions(int argumentCount, char** arguments) {
+    Options options;
+    opterr = 0;
+    optind = 0; // glibc: also forget where an earlier call stopped inside an argument
+    // The plus: the first word that is no option is the program, and what follows is the program's.
+    for (int next = 0; (next = ::getopt_long(argumentCount, arguments, "+:", known, nullptr)) != -1;)
+        if (auto end = take(next, optarg, arguments[optind - 1], options))
+            return std::unexpected(std::move(*end));
+    options.command.assign(arguments + optind, arguments + argumentCount);
+    if (options.identifier.empty())
+        return std::unexpected(usage("--identifier is missing, or empty"));
+    if (options.user == rootUser)
+        return std::unexpected(usage("--user is missing"));
+    if (options.command.empty() || options.command.front().empty())
+        return std::unexpected(usage("no program is named"));
+    return options;
+}
+
+} // namespace zorvanerun

@@ -1,0 +1,39 @@
+// SPDX-License-Identifier: Apache-2.0
+// The command line, as a value.
+#pragma once
+
+#include <cstdint>
+#include <expected>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace zorvanerun {
+
+struct Options {
+    std::string root = "/";
+    std::string identifier;
+    std::uint32_t user = 0;
+    // Named by hand; none: all that are registered.
+    std::vector<std::string> applicationGroups;
+    std::vector<std::string> systemGroups;
+    /// The owner of the system container, where one is asked for by hand.
+    std::optional<std::string> systemContainer;
+    /// Directories that the program may read besides the system's own: its code, for instance.
+    std::vector<std::string> readOnly;
+    std::string bubblewrap = "/usr/bin/bwrap";
+    bool dryRun = false;
+    bool json = false;
+    /// The program and its arguments; never empty.
+    std::vector<std::string> command;
+};
+
+/// What is to be said instead of running, and the exit code for it: help on standard output, errors on standard error.
+struct OptionsEnd {
+    std::string text;
+    int exitCode = 0;
+};
+
+[[nodiscard]] std::expected<Options, OptionsEnd> parseOptions(int argumentCount, char** arguments);
+
+} // namespace zorvanerun

@@ -1,0 +1,106 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "Registered.h"
+
+#include "zorvane/Client.h"
+
+namespace zorvanerun {
+
+namespace {
+
+constexpr std::uint32_t answerMilliseconds = 30'000;
+/// The daemon's code for an identifier that is not entitled to a system container.
+constexpr std::uint64_t codeNotEntitled = 55;
+
+Failure failureOf(const zorvane::Error& error, const std::string& what) {
+    using Kind = zorvane::Error::Kind;
+    Failure failure{.what = what + ": " + error.message, .advice = {}};
+    switch (error.kind) {
+    case Kind::unreachable:
+        failure.advice = "start the daemon (systemctl start zorvaned), or name its root with --root";
+        break;
+    case Kind::refused:
+        failure.advice = "register this program as the kernel's agent: an entry like the example zorvane-run.plist in "
+                         "etc/zorvane/identities.d, see zorvane-run(8)";
+        break;
+    case Kind::timedOut:
+        failure.advice = "look at the daemon's log (zorvaned.log)";
+        break;
+    case Kind::protocol:
+        failure.advice = "check that daemon and program are of one version";
+        break;
+    case Kind::daemon:
+        failure.what += " (code " + std::to_string(error.code) + ")";
+        failure.advice = zorvane::errorText(error.code).advice;
+        break;
+    }
+    return failure;
+}
+
+std::string registerCommand(const Options& options, const std::string& rest) {
+    const std::string root = options.root == "/" ? "" : "--root " + options.root + " ";
+    return "register it: zorvanectl " + root + "entitlements set " + options.identifier + " " + rest +
+           " (with all else that the identifier is entitled to: what is set takes the place of what was)";
+}
+
+/// Those named, each of which has to be registered; all that are registered when none is named.
+Result<std::set<std::string>> choose(const zorvane::Client::GroupPaths& registered,
+                                     const std::vector<std::string>& named, const char* kind, const char* option,
+                                     const Options& options) {
+    std::set<std::string> chosen(named.begin(), named.end());
+    for (const std::string& group : chosen)
+        if (!registered.contains(group))
+            return std::unexpected(
+                Failure{.what = group + " is no " + kind + " group that is registered for " + options.identifier,
+                        .advice = registerCommand(options, std::string(option) + " " + group)});
+    if (named.empty())
+        for (const auto& [group, path] : registered)
+            chosen.insert(group);
+    return chosen;
+}
+
+Result<bool> chooseSystemContainer(zorvane::Client& client, const Options& options) {
+    if (options.systemContainer && *options.systemContainer != options.identifier)
+        return std::unexpected(Failure{
+            .what = "the system container of " + *options.systemContainer + " cannot be given to " + options.identifier,
+            .advice = "name the identifier itself: a system container has one owner. What several share is a "
+                      "system group's"});
+    const auto path = client.systemContainerPath(options.identifier);
+    if (path)
+        return true;
+    if (path.error().kind != zorvane::Error::Kind::daemon || path.error().code != codeNotEntitled)
+        return std::unexpected(
+            failureOf(path.error(), "cannot look for the system container of " + options.identifier));
+    if (!options.systemContainer)
+        return false;
+    return std::unexpected(Failure{.what = "no system container is registered for " + options.identifier,
+                                   .advice = registerCommand(options, "--system-container")});
+}
+
+} // namespace
+
+Result<WantedContainers> chooseContainers(const Options& options) {
+    const std::string what = "cannot look for the groups of " + options.identifier;
+    auto client = zorvane::Client::connect({.root = options.root, .timeoutMilliseconds = answerMilliseconds});
+    if (!client)
+        return std::unexpected(failureOf(client.error(), what));
+    const auto application = client->groupContainerPaths(options.user, options.identifier);
+    if (!application)
+        return std::unexpected(failureOf(application.error(), what));
+    const auto system = client->systemGroupContainerPaths(options.identifier);
+    if (!system)
+        return std::unexpected(failureOf(system.error(), what));
+    auto applicationGroups = choose(*application, options.applicationGroups, "application", "--app-group", options);
+    if (!applicationGroups)
+        return std::unexpected(applicationGroups.error());
+    auto systemGroups = choose(*system, options.systemGroups, "system", "--system-group", options);
+    if (!systemGroups)
+        return std::unexpected(systemGroups.error());
+    const auto systemContainer = chooseSystemContainer(*client, options);
+    if (!systemContainer)
+        return std::unexpected(systemContainer.error());
+    return WantedContainers{.applicationGroups = std::move(*applicationGroups),
+                            .systemGroups = std::move(*systemGroups),
+                            .systemContainer = *systemContainer};
+}
+
+} // namespace zorvanerun

@@ -1,0 +1,17 @@
+// SPDX-License-Identifier: Apache-2.0
+// Which containers a program gets: those that are registered for its identifier, or those of them that were named by
+// hand. What nothing registered refers to is never asked for: the next boot would delete it.
+//
+// What is registered is learnt by asking as a peer without power over others: such a one is told exactly that. The
+// containers are made where they are missing.
+#pragma once
+
+#include "Failure.h"
+#include "Options.h"
+#include "ToldContainers.h"
+
+namespace zorvanerun {
+
+[[nodiscard]] Result<WantedContainers> chooseContainers(const Options& options);
+
+} // namespace zorvanerun

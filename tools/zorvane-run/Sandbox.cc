@@ -1,0 +1,86 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "Sandbox.h"
+
+#include "Inside.h"
+
+#include <algorithm>
+#include <set>
+#include <string_view>
+#include <unistd.h>
+
+namespace zorvanerun {
+
+namespace {
+
+/// For what several processes of the program share; it counts as the program's memory.
+constexpr const char* temporaryBytesMax = "67108864";
+
+void append(std::vector<std::string>& to, std::initializer_list<std::string> more) {
+    to.insert(to.end(), more);
+}
+
+/// The directories above a mount, made so that everybody may pass: the maker's own way is to close them.
+void makeParents(std::vector<std::string>& arguments, const std::string& path, std::set<std::string>& made) {
+    for (std::size_t end = path.find('/', 1); end != path.npos; end = path.find('/', end + 1))
+        if (made.insert(path.substr(0, end)).second)
+            append(arguments, {"--perms", "0755", "--dir", path.substr(0, end)});
+}
+
+std::string linesOf(const std::map<std::string, std::string>& groups) {
+    std::string lines;
+    for (const auto& [identifier, path] : groups)
+        lines += (lines.empty() ? "" : "\n") + identifier + "\t" + path;
+    return lines;
+}
+
+/// How to speak to a person; nothing else of the caller's is the program's business.
+bool isPassedOn(std::string_view variable) {
+    constexpr std::string_view names[] = {"LANG=", "LANGUAGE=", "TERM=", "TZ="};
+    return variable.starts_with("LC_") ||
+           std::ranges::any_of(names, [&](std::string_view name) { return variable.starts_with(name); });
+}
+
+} // namespace
+
+std::vector<std::string> sandboxArguments(const Options& options, const std::vector<Mount>& mounts,
+                                          const ToldContainers& told, InsideHandles handles) {
+    std::vector<std::string> arguments = {options.bubblewrap, "--unshare-pid",     "--unshare-ipc", "--unshare-uts",
+                                          "--new-session",    "--die-with-parent", "--cap-drop",    "ALL"};
+    for (const char* capability : {"CAP_SETUID", "CAP_SETGID", "CAP_SETPCAP"})
+        append(arguments, {"--cap-add", capability});
+    append(arguments, {"--proc", "/proc", "--dev", "/dev"});
+    for (const char* place : {"/dev/shm", "/tmp"})
+        append(arguments, {"--perms", "1777", "--size", temporaryBytesMax, "--tmpfs", place});
+    std::set<std::string> made = {"/proc", "/dev", "/dev/shm", "/tmp"};
+    for (const Mount& mount : mounts) {
+        makeParents(arguments, mount.path, made);
+        if (mount.linkTarget.empty())
+            append(arguments, {mount.isContainer() ? "--bind-fd" : "--ro-bind-fd",
+                               std::to_string(mount.descriptor.get()), mount.path});
+        else
+            append(arguments, {"--symlink", mount.linkTarget, mount.path});
+    }
+    append(arguments, {"--", "/proc/self/fd/" + std::to_string(handles.program), insideOption,
+                       std::to_string(handles.channel), std::to_string(options.user), told.data});
+    arguments.insert(arguments.end(), options.command.begin(), options.command.end());
+    return arguments;
+}
+
+std::vector<std::string> sandboxEnvironment(const Options& options, const ToldContainers& told) {
+    std::vector<std::string> environment = {
+        "HOME=" + told.data,
+        "TMPDIR=" + told.temporary,
+        "PATH=/usr/local/bin:/usr/bin:/bin",
+        "ZORVANE_IDENTIFIER=" + options.identifier,
+        "ZORVANE_APP_GROUPS=" + linesOf(told.applicationGroups),
+        "ZORVANE_SYSTEM_GROUPS=" + linesOf(told.systemGroups),
+    };
+    if (told.systemContainer)
+        environment.push_back("ZORVANE_SYSTEM_CONTAINER=" + *told.systemContainer);
+    for (char** variable = ::environ; variable && *variable; ++variable)
+        if (isPassedOn(*variable))
+            environment.emplace_back(*variable);
+    return environment;
+}
+
+} // namespace zorvanerun

@@ -1,0 +1,178 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "Supervisor.h"
+
+#include "Descriptors.h"
+#include "Sandbox.h"
+
+#include <cerrno>
+#include <csignal>
+#include <cstdio>
+#include <fcntl.h>
+#include <poll.h>
+#include <sys/prctl.h>
+#include <sys/signalfd.h>
+#include <sys/socket.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+namespace zorvanerun {
+
+using zor::platform::FileDescriptor;
+
+namespace {
+
+constexpr int passedOn[] = {SIGHUP, SIGINT, SIGQUIT, SIGTERM, SIGUSR1, SIGUSR2};
+
+std::vector<char*> pointersTo(std::vector<std::string>& texts) {
+    std::vector<char*> pointers;
+    for (std::string& text : texts)
+        pointers.push_back(text.data());
+    pointers.push_back(nullptr);
+    return pointers;
+}
+
+sigset_t signalSet() {
+    sigset_t set;
+    ::sigemptyset(&set);
+    for (const int number : passedOn)
+        ::sigaddset(&set, number);
+    return set;
+}
+
+Failure failure(const std::string& what, int number) {
+    return {.what = withReason(what, number), .advice = "see what limits this process"};
+}
+
+/// The process outside and, from when there is one, the program inside.
+class Supervisor {
+public:
+    Supervisor(pid_t maker, FileDescriptor channel, FileDescriptor signals)
+        : maker_(maker), channel_(std::move(channel)), signals_(std::move(signals)) {}
+
+    /// Waits for the end. nullopt when the program never began.
+    std::optional<int> wait() {
+        for (;;) {
+            pollfd events[] = {{.fd = signals_.get(), .events = POLLIN, .revents = 0},
+                               {.fd = channel_.get(), .events = POLLIN, .revents = 0}};
+            if (::poll(events, 2, -1) < 0 && errno != EINTR)
+                return end(SIGKILL);
+            if (events[1].revents != 0)
+                takeProgram();
+            if (events[0].revents != 0)
+                takeSignals();
+            if (const auto status = ended())
+                return *status;
+        }
+    }
+
+private:
+    void takeProgram() {
+        program_ = receiveDescriptor(channel_.get());
+        channel_.reset(); // one message, or none
+        for (const int number : early_)
+            pass(number);
+        early_.clear();
+    }
+
+    void takeSignals() {
+        signalfd_siginfo info{};
+        while (::read(signals_.get(), &info, sizeof info) == static_cast<ssize_t>(sizeof info)) {
+            const auto number = static_cast<int>(info.ssi_signo);
+            if (number == SIGCHLD)
+                continue; // the loop looks
+            if (channel_.valid())
+                early_.push_back(number);
+            else
+                pass(number);
+        }
+    }
+
+    void pass(int number) const {
+        if (program_.valid())
+            (void)::syscall(SYS_pidfd_send_signal, program_.get(), number, nullptr, 0);
+    }
+
+    std::optional<int> end(int number) {
+        ::kill(maker_, number);
+        ::waitpid(maker_, nullptr, 0);
+        return std::nullopt;
+    }
+
+    /// The inner optional is empty when the program never began.
+    std::optional<std::optional<int>> ended() {
+        int status = 0;
+        pid_t waited = 0;
+        do {
+            waited = ::waitpid(maker_, &status, WNOHANG);
+        } while (waited < 0 && errno == EINTR);
+        if (waited != maker_)
+            return std::nullopt;
+        if (channel_.valid())
+            takeProgram();
+        if (!program_.valid())
+            return std::optional<int>();
+        return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+    }
+
+    const pid_t maker_;
+    FileDescriptor channel_;
+    FileDescriptor signals_;
+    FileDescriptor program_;
+    std::vector<int> early_;
+};
+
+/// In the child: becomes the maker of the sandbox. Never returns.
+[[noreturn]] void executeMaker(const std::vector<Mount>& mounts, InsideHandles handles, pid_t parent,
+                               std::vector<char*>& arguments, std::vector<char*>& environment) {
+    bool kept = keepOnExec(handles.program) && keepOnExec(handles.channel);
+    for (const Mount& mount : mounts)
+        kept = kept && (!mount.descriptor.valid() || keepOnExec(mount.descriptor.get()));
+    // Until the maker asks for the same itself.
+    kept = kept && ::prctl(PR_SET_PDEATHSIG, SIGKILL) == 0 && ::getppid() == parent;
+    // The signals stay blocked; only that of children is the maker's own to wait for.
+    const sigset_t blocked = signalSet();
+    if (kept && ::sigprocmask(SIG_SETMASK, &blocked, nullptr) == 0)
+        ::execve(arguments[0], arguments.data(), environment.data());
+    std::fprintf(stderr, "zorvane-run: %s\n",
+                 printable(withReason("cannot execute " + std::string(arguments[0]), errno)).c_str());
+    ::_exit(exitFailure);
+}
+
+} // namespace
+
+Result<int> runSandboxed(const Options& options, const std::vector<Mount>& mounts, const ToldContainers& told) {
+    const FileDescriptor program(::open("/proc/self/exe", O_PATH | O_CLOEXEC));
+    if (!program.valid())
+        return std::unexpected(failure("cannot open this program", errno));
+    int ends[2] = {};
+    if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends) != 0)
+        return std::unexpected(failure("cannot make a socket", errno));
+    FileDescriptor channel(ends[0]);
+    FileDescriptor inner(ends[1]);
+    sigset_t caught = signalSet();
+    ::sigaddset(&caught, SIGCHLD);
+    FileDescriptor signals(::signalfd(-1, &caught, SFD_CLOEXEC | SFD_NONBLOCK));
+    if (!signals.valid() || ::sigprocmask(SIG_BLOCK, &caught, nullptr) != 0)
+        return std::unexpected(failure("cannot catch signals", errno));
+    const InsideHandles handles{.program = program.get(), .channel = inner.get()};
+    std::vector<std::string> arguments = sandboxArguments(options, mounts, told, handles);
+    std::vector<std::string> environment = sandboxEnvironment(options, told);
+    std::vector<char*> argumentPointers = pointersTo(arguments);
+    std::vector<char*> environmentPointers = pointersTo(environment);
+    const pid_t self = ::getpid();
+    const pid_t maker = ::fork();
+    if (maker < 0)
+        return std::unexpected(failure("cannot make a process", errno));
+    if (maker == 0)
+        executeMaker(mounts, handles, self, argumentPointers, environmentPointers);
+    inner.reset(); // or the channel would never end
+    if (const auto exitCode = Supervisor(maker, std::move(channel), std::move(signals)).wait())
+        return *exitCode;
+    return std::unexpected(
+        Failure{.what = "the sandbox could not be made; " + options.bubblewrap + " or zorvane-run said why above",
+                .advice = "install bubblewrap (0.8.0-2+deb12u1 or newer), and allow mount, process and IPC namespaces "
+                          "where this runs"});
+}
+
+} // namespace zorvanerun

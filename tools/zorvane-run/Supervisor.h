@@ -1,0 +1,18 @@
+// SPDX-License-Identifier: Apache-2.0
+// Starts the sandbox, passes signals on to the program in it, and waits for its end.
+//
+// The sandbox's maker keeps a process of its own outside, which a signal would simply kill, and the program with it. So
+// those signals are blocked there, caught here, and sent to the program itself, through a descriptor that can be no
+// other process. When this process is killed the sandbox ends with it.
+#pragma once
+
+#include "Failure.h"
+#include "Mounts.h"
+
+namespace zorvanerun {
+
+/// The exit code of the program, or why it never began.
+[[nodiscard]] Result<int> runSandboxed(const Options& options, const std::vector<Mount>& mounts,
+                                       const ToldContainers& told);
+
+} // namespace zorvanerun

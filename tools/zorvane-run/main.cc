@@ -1,0 +1,72 @@
+// SPDX-License-Identifier: Apache-2.0
+// zorvane-run: runs a program as a user in a sandbox that holds the containers of its identifier. A device's service
+// manager calls it as root.
+//
+// What a kill leaves: the containers that were made so far, each whole; the sandbox ends with this process.
+#include "Descriptors.h"
+#include "Inside.h"
+#include "Mounts.h"
+#include "Options.h"
+#include "Output.h"
+#include "Registered.h"
+#include "Supervisor.h"
+#include "Upcall.h"
+
+#include <algorithm>
+#include <cstdio>
+#include <cstring>
+#include <unistd.h>
+
+namespace {
+
+using namespace zorvanerun;
+
+/// What the environment's lists, one line for each, could not tell apart.
+bool hasControlCharacters(const WantedContainers& wanted, const std::string& identifier) {
+    const auto isPlain = [](const std::string& text) { return printable(text) == text; };
+    return !isPlain(identifier) || !std::ranges::all_of(wanted.applicationGroups, isPlain) ||
+           !std::ranges::all_of(wanted.systemGroups, isPlain);
+}
+
+Result<int> run(const Options& options) {
+    if (::geteuid() != 0)
+        return std::unexpected(
+            Failure{.what = "this needs root: only root may ask for the containers of others, and become user " +
+                            std::to_string(options.user),
+                    .advice = "call it from the service manager, or with sudo"});
+    if (!fillStandardDescriptors() || !closeOnExecFrom(STDERR_FILENO + 1))
+        return std::unexpected(Failure{.what = "cannot set up this process's descriptors",
+                                       .advice = "use a kernel of 5.11 or newer, and mount /dev"});
+    const auto root = Root::open(options.root);
+    if (!root)
+        return std::unexpected(root.error());
+    const auto wanted = chooseContainers(options);
+    if (!wanted)
+        return std::unexpected(wanted.error());
+    if (hasControlCharacters(*wanted, options.identifier))
+        return std::unexpected(
+            Failure{.what = "an identifier holds control characters", .advice = "register groups under other names"});
+    const auto told = askForContainers(*root, options, *wanted);
+    if (!told)
+        return std::unexpected(told.error());
+    const auto mounts = openMounts(*root, options, *told);
+    if (!mounts)
+        return std::unexpected(mounts.error());
+    if (options.dryRun)
+        return showPlan(options, *mounts, *told);
+    return runSandboxed(options, *mounts, *told);
+}
+
+} // namespace
+
+int main(int argumentCount, char** arguments) {
+    if (argumentCount > 1 && std::strcmp(arguments[1], insideOption) == 0)
+        ::_exit(runInside(argumentCount, arguments)); // there is nothing to be tidied up in the sandbox
+    const auto options = parseOptions(argumentCount, arguments);
+    if (!options) {
+        std::fputs(options.error().text.c_str(), options.error().exitCode == exitDone ? stdout : stderr);
+        return options.error().exitCode;
+    }
+    const auto exitCode = run(*options);
+    return exitCode ? *exitCode : sayFailure(*options, exitCode.error());
+}
