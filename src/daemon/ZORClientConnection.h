@@ -14,6 +14,7 @@
 #include "daemon/base/Result.h"
 #include "daemon/base/UUID.h"
 #include "daemon/base/ZORLocks.h"
+#include "plist/Value.h"
 #include "store/ZORMetadata.h"
 
 #include <atomic>
@@ -23,6 +24,7 @@
 #include <functional>
 #include <memory>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -102,6 +104,68 @@ public:
     Result<void> deleteContainerForUser(std::uint32_t userId, const std::string* identifier,
                                         ContainerClass containerClass, bool transient);
 
+    // Replace (Replace.cc).
+    enum class PreserveOldUUID { no, yes };
+    struct ReplaceRequest {
+        std::optional<UUID> oldUuid; // absent: the new container becomes the live one of its identifier
+        std::optional<UUID> newUuid;
+        std::uint32_t userIdOld = 0;
+        std::uint32_t userIdNew = 0;
+        std::optional<std::string> identifierOld;
+        std::optional<std::string> identifierNew;
+        ContainerClass classOld = ContainerClass::undefined;
+        ContainerClass classNew = ContainerClass::undefined;
+        PreserveOldUUID preserveOldUuid = PreserveOldUUID::no;
+    };
+    /// Puts the new container in the place of the old one, under the all-identifiers lock held for writing. Errors 10,
+    /// 11, 14, 15, 21 to 23, 27, 33, 34, 36, 40, 45, 46, 56. From error 15 on the old container is gone: it waits on
+    /// death row.
+    Result<void> replaceContainer(const ReplaceRequest& request, StartDeletionThread startDeletionThread);
+    /// Undoes or finishes what a stop interrupted. At the launch, without locks. Errors 35, 36.
+    Result<void> _recoverFromReplaceOperationsWithError();
+
+    // One container that is known by its UUID (InfoValues.cc, Structure.cc, DiskUsage.cc). Each takes the lock of the
+    // UUID's string. An absent UUID or identifier is an error: 11, 21.
+    struct ContainerAddress {
+        std::uint32_t userId = 0;
+        std::optional<UUID> uuid;
+        std::optional<std::string> identifier;
+        ContainerClass containerClass = ContainerClass::undefined;
+    };
+    /// `value` nullptr removes the key. Errors 11, 21, 34, 38 (no key), 40, 45. Unless the info would be more than the
+    /// file can hold, the record keeps the new info when the file cannot be written.
+    Result<void> setInfoValue(const plist::Value* value, const std::string* key, const ContainerAddress& address,
+                              UseLocking useLocking);
+    /// Errors 11, 21, 24 (no such key; not logged), 38, 40.
+    Result<plist::Value> infoValueForKey(const std::string* key, const ContainerAddress& address,
+                                         UseLocking useLocking);
+    struct ContainerMetadata {
+        std::string path;
+        bool transient = false;
+        ZORMetadata::Info info; // nullptr: none
+    };
+    Result<ContainerMetadata> metadataForUser(const ContainerAddress& address);
+    /// Makes missing standard subdirectories, and sets mode and owner of those that are there. Error 6.
+    Result<void> recreateDefaultStructureForUser(const ContainerAddress& address);
+    /// Gives the container's directory a new random name. Errors 45, 48.
+    Result<void> regenerateDirectoryUUIDForUser(const ContainerAddress& address);
+    /// Allocated bytes; of bundles measured once. `error` is the code. Walks without any lock.
+    struct DiskUsageAnswer {
+        std::uint64_t bytes = 0;
+        ErrorCode error = ErrorCode::success;
+    };
+    DiskUsageAnswer diskUsageForUserId(const ContainerAddress& address);
+
+    // Wipe (Wipe.cc).
+    /// Replaces all content of a data container by that of a fresh one; path and UUID stay. Errors 11, 18, 55, and
+    /// those of creation and replace.
+    Result<void> deleteDataContainerContentForUser(std::uint32_t userId, const std::string* identifier,
+                                                   ContainerClass containerClass);
+
+    // Retry test (RetryTest.cc).
+    /// Ends the process until it has done so often enough. For internal builds.
+    Result<void> retryTestForUser(std::uint32_t userId, std::uint64_t numCrashes);
+
     // Listing (Listing.cc).
     struct ListedContainer {
         std::string identifier;
@@ -142,13 +206,35 @@ private:
     Result<void> stageForDelete(const DeletionBatch& batch, std::size_t index, std::vector<FileURL>& changed);
     /// False, logged, when the container stays where it is.
     bool takeAwayForDelete(const FileURL& container, std::vector<FileURL>& changed);
-    Result<void> makeDeletionsDurable(std::vector<FileURL> changed);
+    /// Makes what was moved into or out of these directories durable; the error is not logged.
+    std::optional<ZORError> syncDirectories(std::vector<FileURL> changed);
+
+    Result<void> checkReplace(const ReplaceRequest& request);
+    struct ReplaceProgress;
+    Result<void> swapContainers(const ReplaceRequest& request, ReplaceProgress& progress);
+    Result<void> prepareReplace(const ReplaceRequest& request, ReplaceProgress& progress);
+    Result<void> moveOldAway(const ReplaceRequest& request, ReplaceProgress& progress);
+    Result<void> putNewInPlace(const ReplaceRequest& request, ReplaceProgress& progress);
+    Result<void> refuseSecondOfIdentifier(const ReplaceProgress& progress);
+    void recoverFromException(const ReplaceProgress& progress);
+    std::optional<ZORError> cleanUpReplace(const ReplaceProgress& progress, StartDeletionThread startDeletionThread);
+    Result<void> recoverReplace(const FileURL& journalUrl);
+
+    Result<std::shared_ptr<ZORMetadata>> knownContainer(const char* function, const ContainerAddress& address);
+    Result<void> checkAddress(const char* function, const ContainerAddress& address);
+    Result<std::uint64_t> diskUsage(const ContainerAddress& address);
+    /// What an earlier measurement left; the caller holds the container's lock.
+    std::optional<std::uint64_t> keptDiskUsage(const ContainerAddress& address);
+    void keepDiskUsage(const ContainerAddress& address, const FileURL& measured, std::uint64_t bytes);
+    Result<void> checkWipe(std::uint32_t userId, const std::string* identifier, ContainerClass containerClass);
 
     void runDeletionPass(const std::function<void(ErrorCode)>& completion);
     std::optional<ZORError> deleteEverythingOnDeathRow();
     bool isOrphan(const FileURL& entry, ContainerClass containerClass);
     void reportOrphan(const FileURL& entry);
     void sweepStaging();
+    /// Names in staging that journals on the disk still speak of.
+    std::set<std::string, std::less<>> stagedByJournals();
     void makeDirectoriesDurable();
 
     StoreServices& services_;

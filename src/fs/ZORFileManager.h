@@ -79,6 +79,8 @@ public:
     void printDirectoryStructureAtURL(const FileURL& url);
     /// Allocated bytes of everything below that is no directory, hard links once.
     [[nodiscard]] std::uint64_t diskUsageForURL(const FileURL& url);
+    /// The same of a directory that was opened before; `url` is its name in messages.
+    [[nodiscard]] std::uint64_t diskUsageOfDirectory(const fs::OpenResult& directory, const FileURL& url);
 
     // Existence. An item that cannot be examined neither exists nor does not exist.
     [[nodiscard]] bool itemExistsAtURL(const FileURL& url);

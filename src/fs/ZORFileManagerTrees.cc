@@ -314,7 +314,11 @@ std::uint64_t ZORFileManager::diskUsageForURL(const FileURL& url) {
         log_.write(logLevelError, function, "Failed to get path to url %s", url.c_str());
         return 0;
     }
-    const auto directory = resolver_.openDirectory(url);
+    return diskUsageOfDirectory(resolver_.openDirectory(url), url);
+}
+
+std::uint64_t ZORFileManager::diskUsageOfDirectory(const fs::OpenResult& directory, const FileURL& url) {
+    constexpr const char* function = "diskUsageForURL";
     if (!directory) {
         log_.write(logLevelError, function, "Failed to open directory %s : %s", url.c_str(),
                    errorText(directory.error()));

@@ -78,7 +78,7 @@ void ZORContainerCache::store(ClassCache& cache, Record record) {
     cache.insert(std::move(record));
 }
 
-Result<ZORContainerCache::Record> ZORContainerCache::findRecord(const Key& key, const std::string& identifier) {
+Result<ZORContainerCache::Found> ZORContainerCache::findRecord(const Key& key, const std::string& identifier) {
     const MutexLock held(cacheLock_);
     const auto cache = _getCacheForUserId(key);
     if (!cache)
@@ -88,21 +88,21 @@ Result<ZORContainerCache::Record> ZORContainerCache::findRecord(const Key& key, 
         return makeError(log_, {"containerForUser", __LINE__}, ErrorCode::notFound, nullptr, LogFlag::no,
                          "Cache: %s%s: Container Not Found with ID: %s", className(key.containerClass),
                          suffix(key.transient), ZOR_SHOWN(identifier));
-    return *found;
+    return Found{.record = *found, .place = (*found)->place()};
 }
 
-Result<void> ZORContainerCache::checkOnDisk(Here here, const Key& key, const ZORMetadata& record,
+Result<void> ZORContainerCache::checkOnDisk(Here here, const Key& key, const Found& found,
                                             const char* foundFormatPrefix) {
-    if (!record.hasUrl())
+    if (found.place.empty())
         return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
                          "Cache: %s%s: nil URL from %s", className(key.containerClass), suffix(key.transient),
                          "(null)");
-    const FileURL file = record.url().appendingFile(names::metadataFile);
+    const FileURL file = found.place.url().appendingFile(names::metadataFile);
     // A link or anything else in the file's place is no metadata file: the owner of the container can put it there.
     const auto item = fileManager_.resolver().openItem(file, O_PATH);
     struct stat status{};
     if (item && ::fstat(item->get(), &status) == 0 && S_ISREG(status.st_mode)) {
-        traceIdentifier(here, key, foundFormatPrefix, record.identifier());
+        traceIdentifier(here, key, foundFormatPrefix, found.record->identifier());
         return {};
     }
     if (!item && item.error() != ENOENT)
@@ -125,13 +125,13 @@ Result<ZORContainerCache::Record> ZORContainerCache::containerForUser(std::uint3
             return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes, "Invalid identifier: %s",
                              "(null)");
         const Key key{userId, containerClass, transient};
-        Record record = TRY(findRecord(key, *identifier));
-        if (!record->hasUrl())
+        const Found found = TRY(findRecord(key, *identifier));
+        if (found.place.empty())
             return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
                              "Cache: %s%s: Invalid URL path string: %s", className(containerClass), suffix(transient),
                              "(null)");
-        TRY(checkOnDisk(here, key, *record, "Found"));
-        return record;
+        TRY(checkOnDisk(here, key, found, "Found"));
+        return found.record;
     });
 }
 
@@ -141,7 +141,9 @@ ZORContainerCache::Record ZORContainerCache::containerForUser(std::uint32_t user
     for (const bool transient : {false, true}) {
         const auto record = containerForUser(userId, containerClass, identifier, transient);
         if (record && (*record)->uuid().string() == uuidString) {
-            (*record)->setTransient(transient);
+            // Readers of one container may be here together: nothing is written that is so already.
+            if ((*record)->transient() != transient)
+                (*record)->setTransient(transient);
             return *record;
         }
     }
@@ -156,16 +158,21 @@ ZORContainerCache::allContainersForUser(std::uint32_t userId, ContainerClass con
             return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
                              "Invalid Content Class: %ld", number(containerClass));
         const Key key{userId, containerClass, transient};
-        std::vector<Record> records;
+        std::vector<Found> all;
         {
             const MutexLock held(cacheLock_);
             const auto cache = _getCacheForUserId(key);
             if (!cache)
                 return failedToRebuild(here, key, cache.error());
-            records.assign((*cache)->begin(), (*cache)->end());
+            all.reserve((*cache)->size());
+            for (const Record& record : **cache)
+                all.push_back({.record = record, .place = record->place()});
         }
-        std::erase_if(records,
-                      [&](const Record& record) { return !checkOnDisk(here, key, *record, "ALL Found").has_value(); });
+        std::vector<Record> records;
+        records.reserve(all.size());
+        for (Found& found : all)
+            if (checkOnDisk(here, key, found, "ALL Found"))
+                records.push_back(std::move(found.record));
         return records;
     });
 }

@@ -81,10 +81,16 @@ private:
 
     Result<ClassCache*> _getCacheForUserId(const Key& key) ZOR_REQUIRES(cacheLock_);
     Result<ClassCache> readClassDirectory(const Key& key);
-    Result<Record> findRecord(const Key& key, const std::string& identifier) ZOR_EXCLUDES(cacheLock_);
+    /// A record and where it lay when the cache was looked at. Another operation may move the container meanwhile; who
+    /// holds the lock of this very container sees both agree.
+    struct Found {
+        Record record;
+        ContainerPlace place;
+    };
+    Result<Found> findRecord(const Key& key, const std::string& identifier) ZOR_EXCLUDES(cacheLock_);
     ZORError failedToRebuild(Here here, const Key& key, const ZORError& cause);
     /// Code 44 or 47 unless the record's metadata file is there.
-    Result<void> checkOnDisk(Here here, const Key& key, const ZORMetadata& record, const char* foundFormatPrefix);
+    Result<void> checkOnDisk(Here here, const Key& key, const Found& found, const char* foundFormatPrefix);
     static void store(ClassCache& cache, Record record);
     /// A level-7 line under the operation's own name, which a lambda inside it does not have.
     void traceIdentifier(Here here, const Key& key, const char* what, const std::string& identifier);

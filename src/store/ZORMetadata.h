@@ -62,6 +62,7 @@ public:
     void setInfo(Info info) { info_ = std::move(info); }
     [[nodiscard]] bool hasUrl() const { return !place_.empty(); }
     [[nodiscard]] FileURL url() const { return place_.url(); }
+    [[nodiscard]] const ContainerPlace& place() const { return place_; }
     void setPlace(ContainerPlace place) { place_ = std::move(place); }
     [[nodiscard]] bool transient() const { return transient_; }
     void setTransient(bool transient) { transient_ = transient; }

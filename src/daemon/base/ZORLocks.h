@@ -82,6 +82,22 @@ private:
     std::int32_t allReaderWriterState_ ZOR_GUARDED_BY(mutex_) = 0;   // 0 free, -1 write-held, n > 0 n readers
 };
 
+/// Holds the lock of one identifier for as long as it lives.
+class IdentifierLock {
+public:
+    IdentifierLock(ZORLocks& locks, std::string identifier, LockMode mode)
+        : locks_(locks), identifier_(std::move(identifier)) {
+        locks_._lock_identifier(identifier_, mode);
+    }
+    IdentifierLock(const IdentifierLock&) = delete;
+    IdentifierLock& operator=(const IdentifierLock&) = delete;
+    ~IdentifierLock() { locks_.unlock_identifier(identifier_); }
+
+private:
+    ZORLocks& locks_;
+    const std::string identifier_;
+};
+
 /// Holds the all-identifiers lock from construction to destruction or `unlock`, whichever comes first.
 class AllIdentifiersLock {
 public:

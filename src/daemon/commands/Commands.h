@@ -24,8 +24,22 @@ void getSystemGroupContainerPaths(CommandContext& context);
 void getSystemGroupContainerPath(CommandContext& context);
 void processEntitlements(CommandContext& context);
 
-// NotServedYet.cc: commands of the table that this version refuses, with an error and a line that says so.
+// InfoCommands.cc
+void setInfoValue(CommandContext& context);
+void getInfoValue(CommandContext& context);
+void getMetadata(CommandContext& context);
+
+// LifecycleCommands.cc
+void replaceContainer(CommandContext& context);
+void recreateDefaultStructure(CommandContext& context);
+void regenerateDirectoryUUID(CommandContext& context);
+void wipeEntitledPluginDataContainer(CommandContext& context);
+void wipeDataContainerContent(CommandContext& context);
+void getDiskUsage(CommandContext& context);
+void retryTest(CommandContext& context);
+
+// NotServedYet.cc: a command of the table that this version refuses, with an error and a line that says so. It replies
+// itself.
 void notServedYet(CommandContext& context);
-void notServedYetDeferred(CommandContext& context);
 
 } // namespace zor::commands

@@ -4,7 +4,7 @@
 #include "daemon/commands/Request.h"
 #include "ipc/Uuid.h"
 
-#include <limits>
+#include <algorithm>
 
 namespace zor::commands {
 
@@ -12,26 +12,35 @@ namespace keys = ipc::keys;
 
 namespace {
 
-/// No valid class; what an integer beyond the unsigned ones stands for.
-constexpr std::uint64_t noClass = std::numeric_limits<std::uint64_t>::max();
-
 const plist::Array& arrayOf(const plist::Dictionary& request, std::string_view key) {
     static const plist::Array none;
     const plist::Array* array = request.array(key);
     return array ? *array : none;
 }
 
+/// Classes and UUIDs are of the right types, and there is a class for every user. Else the context has its error.
+bool listsAreUsable(CommandContext& context, const plist::Array& classes, const plist::Array& uuids) {
+    const std::size_t users = arrayOf(context.request, keys::userIdsArray).size();
+    const auto isUnsigned = [](const plist::Value& element) { return element.asUnsigned().has_value(); };
+    const auto isUuid = [](const plist::Value& element) { return ipc::uuidOf(&element).has_value(); };
+    if (users <= classes.size() && std::ranges::all_of(classes, isUnsigned) && std::ranges::all_of(uuids, isUuid))
+        return true;
+    makeError(context.log, {"stageContainerForDelete", __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
+              "Can't act on an invalid input: user count: %ld, class count: %ld, or an element of another type",
+              static_cast<long>(users), static_cast<long>(classes.size()));
+    context.error = ErrorCode::invalidObject;
+    return false;
+}
+
 /// The users of the list, each resolved for the class beside it. Without all of them the context has its error.
 std::optional<std::vector<std::uint32_t>> usersOf(CommandContext& context, const plist::Array& classes) {
     std::vector<std::uint32_t> users;
-    std::size_t index = 0;
     for (const plist::Value& element : arrayOf(context.request, keys::userIdsArray)) {
-        const std::uint64_t number = index < classes.size() ? classes[index].asUnsigned().value_or(0) : 0;
-        const auto user = validatedUser(context, element.asUnsigned().value_or(0), static_cast<ContainerClass>(number));
+        const auto containerClass = static_cast<ContainerClass>(classes[users.size()].asUnsigned().value_or(0));
+        const auto user = validatedUser(context, element.asUnsigned().value_or(0), containerClass);
         if (!user)
             return std::nullopt;
         users.push_back(*user);
-        ++index;
     }
     return users;
 }
@@ -40,19 +49,17 @@ std::optional<std::vector<std::uint32_t>> usersOf(CommandContext& context, const
 
 void stageContainersForDelete(CommandContext& context) {
     const plist::Array& classes = arrayOf(context.request, keys::containerClassesArray);
+    const plist::Array& uuids = arrayOf(context.request, keys::uuidsArray);
+    if (!listsAreUsable(context, classes, uuids))
+        return;
     auto users = usersOf(context, classes);
     if (!users)
         return;
     ZORClientConnection::DeletionBatch batch{.users = std::move(*users)};
     for (const plist::Value& element : classes)
-        if (element.isInteger())
-            batch.classes.emplace_back(element.asUnsigned().value_or(noClass));
-        else
-            batch.classes.emplace_back(std::unexpected(plist::describe(&element)));
-    for (const plist::Value& element : arrayOf(context.request, keys::uuidsArray)) {
-        const auto bytes = ipc::uuidOf(&element);
-        batch.uuids.push_back(bytes ? std::optional(UUID(*bytes)) : std::nullopt);
-    }
+        batch.classes.emplace_back(element.asUnsigned().value_or(0));
+    for (const plist::Value& element : uuids)
+        batch.uuids.emplace_back(UUID(*ipc::uuidOf(&element)));
     const plist::Array* identifiers = context.request.array(keys::identifiersArray);
     if (!identifiers)
         context.log.write(logLevelError, "stageContainerForDelete", "Got non-Array input for the identifiers array");

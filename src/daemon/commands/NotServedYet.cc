@@ -7,12 +7,7 @@ namespace zor::commands {
 void notServedYet(CommandContext& context) {
     context.log.write(logLevelError, __func__, "Command %llu is not served by this version",
                       static_cast<unsigned long long>(context.request.unsignedInteger(ipc::keys::command).value_or(0)));
-    context.error = ErrorCode::invalidObject;
-}
-
-void notServedYetDeferred(CommandContext& context) {
-    notServedYet(context);
-    context.channel->send({{std::string(ipc::keys::replyError), static_cast<std::uint64_t>(context.error)}});
+    context.channel->send({{std::string(ipc::keys::replyError), static_cast<std::uint64_t>(ErrorCode::invalidObject)}});
 }
 
 } // namespace zor::commands

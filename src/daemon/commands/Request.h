@@ -3,6 +3,7 @@
 #pragma once
 
 #include "daemon/CommandTable.h"
+#include "ipc/Uuid.h"
 
 #include <cstdint>
 #include <optional>
@@ -37,6 +38,28 @@ namespace zor::commands {
 [[nodiscard]] inline std::optional<std::uint32_t> userOf(CommandContext& context, std::string_view key,
                                                          ContainerClass containerClass) {
     return validatedUser(context, context.request.unsignedInteger(key).value_or(0), containerClass);
+}
+
+[[nodiscard]] inline std::optional<std::string> stringIn(const plist::Dictionary& request, std::string_view key) {
+    const std::string* text = request.string(key);
+    return text ? std::optional(*text) : std::nullopt;
+}
+
+[[nodiscard]] inline std::optional<UUID> uuidIn(const plist::Dictionary& request, std::string_view key) {
+    const auto bytes = ipc::uuidOf(request, key);
+    return bytes ? std::optional(UUID(*bytes)) : std::nullopt;
+}
+
+/// The one container that the request names by its UUID. Without a valid user the context has its error.
+[[nodiscard]] inline std::optional<ZORClientConnection::ContainerAddress> addressIn(CommandContext& context) {
+    const ContainerClass containerClass = classOf(context.request, ipc::keys::containerClass);
+    const auto user = userOf(context, ipc::keys::userId, containerClass);
+    if (!user)
+        return std::nullopt;
+    return ZORClientConnection::ContainerAddress{.userId = *user,
+                                                 .uuid = uuidIn(context.request, ipc::keys::uuid),
+                                                 .identifier = stringIn(context.request, ipc::keys::identifier),
+                                                 .containerClass = containerClass};
 }
 
 /// For operations that give nothing but success or an error.

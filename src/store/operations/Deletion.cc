@@ -61,8 +61,11 @@ Result<void> ZORClientConnection::stageForDeleteContainersWithUsers(const Deleti
             return {};
         }();
         // Those staged before a failure are gone for good too.
-        auto synced = makeDeletionsDurable(std::move(changed));
-        return staged ? synced : staged;
+        const auto failed = syncDirectories(std::move(changed));
+        if (!staged || !failed)
+            return staged;
+        return makeError(services_.log, {stageFunction, __LINE__}, ErrorCode::listForDeletionFailed, &*failed,
+                         LogFlag::yes, "Failed to make deletions durable: %s", failed->text().c_str());
     });
 }
 
@@ -131,7 +134,7 @@ bool ZORClientConnection::takeAwayForDelete(const FileURL& container, std::vecto
     return true;
 }
 
-Result<void> ZORClientConnection::makeDeletionsDurable(std::vector<FileURL> changed) {
+std::optional<ZORError> ZORClientConnection::syncDirectories(std::vector<FileURL> changed) {
     const auto path = [](const FileURL& url) { return url.path(); };
     std::ranges::sort(changed, {}, path);
     changed.erase(std::ranges::unique(changed, {}, path).begin(), changed.end());
@@ -139,14 +142,10 @@ Result<void> ZORClientConnection::makeDeletionsDurable(std::vector<FileURL> chan
     for (const FileURL& url : changed) {
         const auto directory = services_.fileManager.resolver().openDirectory(url);
         const int status = directory ? services_.durability.afterMove(directory->get()) : -directory.error();
-        if (status == 0)
-            continue;
-        const ZORError cause =
-            posixError({stageFunction, __LINE__}, -status, "sync of %s failed: %s", url.c_str(), errorText(-status));
-        return makeError(services_.log, {stageFunction, __LINE__}, ErrorCode::listForDeletionFailed, &cause,
-                         LogFlag::yes, "Failed to delete container at %s: %s", url.c_str(), cause.text().c_str());
+        if (status < 0)
+            return posixError(ZOR_HERE, -status, "sync of %s failed: %s", url.c_str(), errorText(-status));
     }
-    return {};
+    return std::nullopt;
 }
 
 Result<void> ZORClientConnection::deleteContainerForUser(std::uint32_t userId, const std::string* identifier,

@@ -10,6 +10,7 @@
 #include "entitlements/ZORWhitelist.h"
 #include "store/Names.h"
 #include "store/StoreServices.h"
+#include "store/operations/ReplaceJournal.h"
 
 #include <array>
 #include <cerrno>
@@ -122,10 +123,25 @@ void ZORClientConnection::sweepStaging() {
                                 staging.c_str(), entries.error().text().c_str());
         return;
     }
+    const auto kept = stagedByJournals();
     for (const FileURL& entry : *entries)
-        (void)_moveItemAtURLToDeathRow(entry, StartDeletionThread::no);
+        if (!kept.contains(entry.lastPathComponent()))
+            (void)_moveItemAtURLToDeathRow(entry, StartDeletionThread::no);
     for (const FileURL& leftover : services_.fileManager.copyLeftoversInDirectoryAtURL(staging))
         (void)_moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
+}
+
+std::set<std::string, std::less<>> ZORClientConnection::stagedByJournals() {
+    std::set<std::string, std::less<>> names;
+    const auto items = services_.fileManager.urlsForItemsInDirectoryAtURL(services_.configuration.replaceDirectory());
+    if (!items)
+        return names;
+    // There are some only when the recovery stopped.
+    for (const FileURL& item : *items)
+        if (const auto journal =
+                ReplaceJournal::_readAndValidateReplaceFileAtUrl(services_.log, services_.fileManager, item))
+            names.emplace(journal->stagingUrl.lastPathComponent());
+    return names;
 }
 
 void ZORClientConnection::makeDirectoriesDurable() {
@@ -138,6 +154,8 @@ void ZORClientConnection::makeDirectoriesDurable() {
 }
 
 void ZORClientConnection::containerManagerSetup() {
+    if (!_recoverFromReplaceOperationsWithError())
+        services_.log.write(logLevelError, __func__, "Failed recovering from replace operations");
     sweepStaging();
     deleteContainersOnDeathRowWithCompletion(nullptr);
     // A stop between the move of a container and its mapping leaves a mapping that points to nothing.

@@ -1,0 +1,78 @@
+// SPDX-License-Identifier: Apache-2.0
+// How many bytes a container takes. What a bundle takes is measured once and kept with its info, since its content does
+// not change; everything else is measured each time.
+//
+// The walk holds no lock: a lookup waits for every identifier lock, so a large container would stop all clients for as
+// long as it is walked. The container is looked up and opened under its lock, and walked on that descriptor; the result
+// is kept only if the lock, taken again, finds the same container at the same place.
+#include "daemon/ZORClientConnection.h"
+#include "store/StoreServices.h"
+
+#include <cerrno>
+#include <expected>
+
+namespace zor {
+
+namespace {
+
+constexpr const char* function = "diskUsageForUserId";
+const std::string staticDiskUsageKey = "com.veltra.Brevance.StaticDiskUsage";
+
+} // namespace
+
+std::optional<std::uint64_t> ZORClientConnection::keptDiskUsage(const ContainerAddress& address) {
+    const auto value = infoValueForKey(&staticDiskUsageKey, address, UseLocking::no);
+    if (value)
+        return value->asUnsigned();
+    if (!value.error().is(ErrorCode::infoKeyNotFound))
+        services_.log.write(
+            logLevelError, function, "Error looking up info value for userId: %u, identifier: %s, Class: %llu: %llu",
+            address.userId, ZOR_SHOWN(address.identifier), static_cast<unsigned long long>(address.containerClass),
+            static_cast<unsigned long long>(value.error().replyCode()));
+    return std::nullopt;
+}
+
+void ZORClientConnection::keepDiskUsage(const ContainerAddress& address, const FileURL& measured, std::uint64_t bytes) {
+    const IdentifierLock lock(services_.locks, address.uuid->string(), LockMode::writing);
+    const auto record = services_.cache.containerForUser(address.userId, address.containerClass, &*address.identifier,
+                                                         address.uuid->string());
+    if (!record || record->url() != measured)
+        return;
+    const plist::Value value(bytes);
+    const auto kept = setInfoValue(&value, &staticDiskUsageKey, address, UseLocking::no);
+    if (!kept)
+        services_.log.write(
+            logLevelError, function, "Error setting info value for userId: %u, identifier: %s, Class: %llu: %llu",
+            address.userId, ZOR_SHOWN(address.identifier), static_cast<unsigned long long>(address.containerClass),
+            static_cast<unsigned long long>(kept.error().replyCode()));
+}
+
+Result<std::uint64_t> ZORClientConnection::diskUsage(const ContainerAddress& address) {
+    TRY(checkAddress(function, address));
+    const bool isBundle = isBundleClass(address.containerClass);
+    FileURL container;
+    fs::OpenResult directory = std::unexpected(ENOENT);
+    {
+        const IdentifierLock lock(services_.locks, address.uuid->string(), LockMode::writing);
+        const auto record = TRY(knownContainer(function, address));
+        if (isBundle)
+            if (const auto kept = keptDiskUsage(address))
+                return *kept;
+        container = record->url();
+        directory = services_.fileManager.resolver().openDirectory(container);
+    }
+    const std::uint64_t bytes = services_.fileManager.diskUsageOfDirectory(directory, container);
+    if (isBundle)
+        keepDiskUsage(address, container, bytes);
+    return bytes;
+}
+
+ZORClientConnection::DiskUsageAnswer ZORClientConnection::diskUsageForUserId(const ContainerAddress& address) {
+    const auto measured =
+        services_.boundary.run({function, __LINE__}, [&]() -> Result<std::uint64_t> { return diskUsage(address); });
+    if (measured)
+        return {.bytes = *measured};
+    return {.bytes = 0, .error = measured.error().replyCode()};
+}
+
+} // namespace zor

@@ -1,0 +1,356 @@
+// SPDX-License-Identifier: Apache-2.0
+// Putting a new container in the place of an old one.
+//
+// The one change of the store that takes more than one move, so it has a journal. What a stop leaves, and what the next
+// launch makes of it:
+//
+//   stopped after                      | on the disk                              | recovery
+//   -----------------------------------|------------------------------------------|----------------------------------
+//   the new one got the old UUID       | both in place                            | none; a transient one is discarded
+//   the journal was written            | journal, both in place                   | journal goes; nothing has happened
+//   the old one moved to staging       | journal, old and destination missing     | old moves back; nothing has
+//   happened the new one moved into place       | journal, destination there, old waiting  | journal goes, staging is
+//   swept: done staging went to death row          | journal, destination there               | the same both went |
+//   destination there                        | none: done
+//
+// A power cut leaves the same states: the journal is synced before the first move, the moves keep their order (where
+// the file system does not see to that, syncs do), and they are on the disk before the journal goes and the client
+// hears.
+//
+// A replace whose second move fails has lost the old container, which went to death row. So everything that can be
+// looked at beforehand is: both directories can be opened, the destination is free.
+#include "daemon/ZORClientConnection.h"
+#include "store/StoreServices.h"
+#include "store/operations/ReplaceJournal.h"
+
+#include <cerrno>
+#include <cstdlib>
+
+namespace zor {
+
+/// How far a replace has come; what its clean-up, and the recovery from an exception, go by.
+struct ZORClientConnection::ReplaceProgress {
+    std::shared_ptr<ZORMetadata> oldRecord; // nullptr: none is replaced
+    std::shared_ptr<ZORMetadata> newRecord;
+    bool oldWasTransient = false;
+    FileURL oldUrl;
+    FileURL newUrl;
+    FileURL destUrl;
+    FileURL stagingUrl;                // empty until it is known
+    FileURL journalUrl;                // the same
+    std::optional<UUID> newUuidBefore; // while the new container's file says the old UUID
+};
+
+namespace {
+
+constexpr const char* replaceFunction = "replaceContainer";
+constexpr const char* recoverFunction = "_recoverFromReplaceOperationsWithError";
+
+const std::string* pointerTo(const std::optional<std::string>& text) {
+    return text ? &*text : nullptr;
+}
+
+std::string shown(const std::optional<UUID>& uuid) {
+    return uuid ? uuid->string() : "(null)";
+}
+
+} // namespace
+
+Result<void> ZORClientConnection::replaceContainer(const ReplaceRequest& request,
+                                                   StartDeletionThread startDeletionThread) {
+    ReplaceProgress progress;
+    const auto swapped = [&]() -> Result<void> {
+        TRY(checkReplace(request));
+        const AllIdentifiersLock lock(services_.locks, LockMode::writing);
+        Result<void> result;
+        try {
+            result = swapContainers(request, progress);
+        } catch (const std::exception& exception) {
+            result = services_.boundary.caught({replaceFunction, __LINE__}, exception);
+            recoverFromException(progress);
+        } catch (...) {
+            (void)cleanUpReplace(progress, startDeletionThread);
+            throw;
+        }
+        if (auto failed = cleanUpReplace(progress, startDeletionThread))
+            return std::move(*failed);
+        return result;
+    }();
+    if (!swapped)
+        return swapped;
+    if (const auto failed = syncDirectories({progress.destUrl.deletingLastPathComponent()}))
+        return makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::newNotMovedIntoPlace, &*failed,
+                         LogFlag::yes, "Failed to replace: %s with: %s at: %s", progress.oldUrl.c_str(),
+                         progress.newUrl.c_str(), progress.destUrl.c_str());
+    return {};
+}
+
+Result<void> ZORClientConnection::checkReplace(const ReplaceRequest& request) {
+    const Log& log = services_.log;
+    const Here here{replaceFunction, __LINE__};
+    if (!request.newUuid || !isValidClass(request.classNew))
+        return makeError(log, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
+                         "Can't act on an invalid object: new userId: %u, newUUID: %s, Class: %ld", request.userIdNew,
+                         shown(request.newUuid).c_str(), static_cast<long>(request.classNew));
+    if (!request.oldUuid && request.preserveOldUuid == PreserveOldUUID::yes)
+        return makeError(log, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
+                         "Can't have a nil oldContainerUUID when preserving the UUID");
+    if (!request.oldUuid)
+        return {};
+    if (!isValidClass(request.classOld))
+        return makeError(log, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
+                         "Can't act on an invalid object: old userId: %u, oldUUID: %s, Class: %ld", request.userIdOld,
+                         shown(request.oldUuid).c_str(), static_cast<long>(request.classOld));
+    if (request.classOld != request.classNew)
+        return makeError(log, here, ErrorCode::classesDiffer, nullptr, LogFlag::yes,
+                         "Can't replace containers of different class types: %ld and %ld",
+                         static_cast<long>(request.classOld), static_cast<long>(request.classNew));
+    if (request.userIdOld != request.userIdNew)
+        return makeError(log, here, ErrorCode::usersDiffer, nullptr, LogFlag::yes,
+                         "Can't replace containers of different userIds: %u and %u", request.userIdOld,
+                         request.userIdNew);
+    return {};
+}
+
+Result<void> ZORClientConnection::swapContainers(const ReplaceRequest& request, ReplaceProgress& progress) {
+    TRY(prepareReplace(request, progress));
+    if (progress.oldRecord)
+        TRY(moveOldAway(request, progress));
+    return putNewInPlace(request, progress);
+}
+
+Result<void> ZORClientConnection::prepareReplace(const ReplaceRequest& request, ReplaceProgress& progress) {
+    const Log& log = services_.log;
+    const Here here{replaceFunction, __LINE__};
+    const auto known = [&](std::uint32_t userId, const std::optional<UUID>& uuid,
+                           const std::optional<std::string>& identifier,
+                           ContainerClass containerClass) -> Result<std::shared_ptr<ZORMetadata>> {
+        auto record = services_.cache.containerForUser(userId, containerClass, pointerTo(identifier), uuid->string());
+        if (!record)
+            return makeError(log, here, ErrorCode::notFound, nullptr, LogFlag::yes,
+                             "No Container with userId: %u UUID: %s, identifier: %s, Class: %ld", userId,
+                             uuid->string().c_str(), ZOR_SHOWN(identifier), static_cast<long>(containerClass));
+        return record;
+    };
+    if (request.oldUuid) {
+        progress.oldRecord = TRY(known(request.userIdOld, request.oldUuid, request.identifierOld, request.classOld));
+        progress.oldUrl = progress.oldRecord->url();
+        progress.oldWasTransient = progress.oldRecord->transient();
+    }
+    progress.newRecord = TRY(known(request.userIdNew, request.newUuid, request.identifierNew, request.classNew));
+    progress.newUrl = progress.newRecord->url();
+    if (progress.newUrl == progress.oldUrl)
+        return makeError(log, here, ErrorCode::replacedByItself, nullptr, LogFlag::yes,
+                         "Can't replace the same container at %s", progress.oldUrl.c_str());
+    const auto directoryUuid = UUID::parse(progress.newUrl.lastPathComponent());
+    if (!directoryUuid)
+        return makeError(log, here, ErrorCode::pathNotAsExpected, nullptr, LogFlag::yes,
+                         "Invalid URL (last path component not UUID): %s", progress.newUrl.c_str());
+    if (request.preserveOldUuid == PreserveOldUUID::yes) {
+        progress.destUrl = progress.oldUrl;
+    } else {
+        const auto classDirectory = services_.configuration.containerDirectoryURLForUser(
+            request.userIdNew, request.classNew, progress.oldWasTransient);
+        if (classDirectory)
+            progress.destUrl = classDirectory->appendingDirectory(directoryUuid->string());
+        if (!classDirectory || !services_.fileManager.itemDoesNotExistAtURL(progress.destUrl))
+            return makeError(log, here, ErrorCode::alreadyExists, nullptr, LogFlag::yes,
+                             "Container already exists at %s", progress.destUrl.c_str());
+    }
+    return refuseSecondOfIdentifier(progress);
+}
+
+Result<void> ZORClientConnection::refuseSecondOfIdentifier(const ReplaceProgress& progress) {
+    const ZORMetadata& record = *progress.newRecord;
+    const bool sameIdentifier = progress.oldRecord && progress.oldRecord->identifier() == record.identifier();
+    const auto live = services_.cache.containerForUser(record.uid(), record.containerClass(), &record.identifier(),
+                                                       progress.oldWasTransient);
+    if (!live && !live.error().is(ErrorCode::notFound))
+        return progress.oldRecord ? Result<void>() : Result<void>(live.error());
+    // With an old one, the one that is found may be the old or the new one itself.
+    if (!live || sameIdentifier || (progress.oldRecord && *live == progress.newRecord))
+        return {};
+    return makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::alreadyExists, nullptr, LogFlag::yes,
+                     "Container with identifier: %s, class: %ld, transient: %d already exists",
+                     ZOR_SHOWN(record.identifier()), static_cast<long>(record.containerClass()),
+                     progress.oldWasTransient);
+}
+
+Result<void> ZORClientConnection::moveOldAway(const ReplaceRequest& request, ReplaceProgress& progress) {
+    const Log& log = services_.log;
+    const Here here{replaceFunction, __LINE__};
+    const auto oldNotMoved = [&](const ZORError& cause) {
+        return makeError(log, here, ErrorCode::oldNotMovedToStaging, &cause, LogFlag::yes,
+                         "Failed to move old %s to staging %s", progress.oldUrl.c_str(), progress.stagingUrl.c_str());
+    };
+    const UUID journalUuid = UUID::random();
+    const FileURL stagingUrl = services_.configuration.stagingDirectory().appendingDirectory(journalUuid.string());
+    // Whoever owns them may have put something else in their places.
+    for (const FileURL* url : {&progress.oldUrl, &progress.newUrl})
+        if (const auto opened = services_.fileManager.resolver().openDirectory(*url); !opened)
+            return oldNotMoved(
+                posixError(here, opened.error(), "open of %s failed: %s", url->c_str(), errorText(opened.error())));
+    if (request.preserveOldUuid == PreserveOldUUID::yes) {
+        progress.newUuidBefore = progress.newRecord->uuid();
+        progress.newRecord->setUuid(progress.oldRecord->uuid());
+        TRY(progress.newRecord->writeMetadataToDiskWithError(log, services_.fileManager));
+    }
+    progress.journalUrl = ReplaceJournal::urlFor(services_.configuration.replaceDirectory(), journalUuid);
+    progress.stagingUrl = stagingUrl;
+    const ReplaceJournal journal{.oldUrl = progress.oldUrl,
+                                 .newUrl = progress.newUrl,
+                                 .stagingUrl = progress.stagingUrl,
+                                 .destUrl = progress.destUrl};
+    if (auto written = journal._writeToDiskReplaceAt(log, services_.fileManager, progress.journalUrl); !written) {
+        log.write(logLevelError, replaceFunction, "Failed to write replace file: %s", written.error().text().c_str());
+        return written;
+    }
+    if (const auto moved = services_.fileManager.moveItemAtURL(progress.oldUrl, progress.stagingUrl); !moved)
+        return oldNotMoved(moved.error());
+    const bool transient = progress.oldWasTransient;
+    const auto removed = services_.cache.removeContainerForUser(request.userIdOld, request.classOld,
+                                                                &progress.oldRecord->identifier(), transient);
+    if (!removed)
+        return makeError(log, here, ErrorCode::cacheRemoveFailed, &removed.error(), LogFlag::yes,
+                         "Failed to remove from cache id: %s, class: %ld, transient: %d",
+                         ZOR_SHOWN(progress.oldRecord->identifier()), static_cast<long>(request.classOld), transient);
+    // Where nothing else keeps the order of two moves, a cut could leave the second one without the first.
+    const auto staging = services_.fileManager.resolver().openDirectory(services_.configuration.stagingDirectory());
+    const int ordered = staging ? services_.durability.beforeRemoval(staging->get()) : -staging.error();
+    if (ordered < 0)
+        return oldNotMoved(
+            posixError(here, -ordered, "sync of %s failed: %s", progress.stagingUrl.c_str(), errorText(-ordered)));
+    return {};
+}
+
+Result<void> ZORClientConnection::putNewInPlace(const ReplaceRequest& request, ReplaceProgress& progress) {
+    const Log& log = services_.log;
+    const Here here{replaceFunction, __LINE__};
+    ZORMetadata& record = *progress.newRecord;
+    const auto moved = services_.fileManager.moveItemAtURL(progress.newUrl, progress.destUrl);
+    if (!moved)
+        return makeError(log, here, ErrorCode::newNotMovedIntoPlace, &moved.error(), LogFlag::yes,
+                         "Failed to replace: %s with: %s at: %s", progress.oldUrl.c_str(), progress.newUrl.c_str(),
+                         progress.destUrl.c_str());
+    progress.newUuidBefore.reset(); // the old UUID is its own from now on
+    const bool newWasTransient = record.transient();
+    const auto removed = services_.cache.removeContainerForUser(request.userIdNew, request.classNew,
+                                                                &record.identifier(), newWasTransient);
+    if (!removed)
+        return makeError(log, here, ErrorCode::cacheRemoveFailed, &removed.error(), LogFlag::yes,
+                         "Failed to remove from cache id: %s, class: %ld, transient: %d",
+                         ZOR_SHOWN(record.identifier()), static_cast<long>(request.classNew), newWasTransient);
+    if (isPerUserClass(request.classNew)) {
+        const bool otherIdentifier =
+            progress.oldRecord && progress.oldRecord->identifier() != record.identifier() && !progress.oldWasTransient;
+        if (otherIdentifier)
+            (void)_setSandboxContainerMappingForUser(request.userIdOld, progress.oldRecord->identifier(),
+                                                     request.classOld, std::nullopt);
+        if (!_setSandboxContainerMappingForUser(request.userIdNew, record.identifier(), request.classNew,
+                                                progress.destUrl))
+            log.write(logLevelError, replaceFunction, "Failed to set container mapping in replace operation");
+    }
+    record.setTransient(progress.oldWasTransient);
+    const auto added = services_.cache.addContainerMetadata(progress.newRecord, request.userIdNew,
+                                                            ContainerPlace(progress.destUrl), progress.oldWasTransient);
+    if (!added)
+        return makeError(log, here, ErrorCode::cacheAddFailed, &added.error(), LogFlag::yes,
+                         "Failed to add to cache: %s, url: %s, transient: %d", ZOR_SHOWN(record.identifier()),
+                         progress.destUrl.c_str(), progress.oldWasTransient);
+    return {};
+}
+
+void ZORClientConnection::recoverFromException(const ReplaceProgress& progress) {
+    ZORFileManager& fileManager = services_.fileManager;
+    if (progress.oldUrl.empty() || progress.destUrl.empty() || !fileManager.itemDoesNotExistAtURL(progress.oldUrl) ||
+        !fileManager.itemDoesNotExistAtURL(progress.destUrl))
+        return;
+    if (services_.log.writes(logLevelDebug))
+        services_.log.write(logLevelDebug, replaceFunction, "Recovering from exception by moving: %s to %s",
+                            progress.stagingUrl.c_str(), progress.oldUrl.c_str());
+    const auto moved = fileManager.moveItemAtURL(progress.stagingUrl, progress.oldUrl);
+    if (moved)
+        return;
+    makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::journalUnusable, &moved.error(), LogFlag::yes,
+              "Failed to recover replace move: %s to %s", progress.stagingUrl.c_str(), progress.oldUrl.c_str());
+    // The journal stays, and the next launch tries again: going on would let the clean-up take the old container.
+    std::abort();
+}
+
+std::optional<ZORError> ZORClientConnection::cleanUpReplace(const ReplaceProgress& progress,
+                                                            StartDeletionThread startDeletionThread) {
+    std::optional<ZORError> failed;
+    if (progress.newUuidBefore) {
+        // It did not take the old one's place: it is again who it was. Should that fail, the file's next writing does
+        // it.
+        progress.newRecord->setUuid(*progress.newUuidBefore);
+        (void)progress.newRecord->writeMetadataToDiskWithError(services_.log, services_.fileManager);
+    }
+    if (!progress.oldRecord || progress.journalUrl.empty())
+        return failed;
+    // The moves are on the disk before the journal can be gone.
+    const FileURL place = progress.destUrl.deletingLastPathComponent();
+    const auto directory = services_.fileManager.resolver().openDirectory(place);
+    const int ordered = directory ? services_.durability.beforeRemoval(directory->get()) : -directory.error();
+    if (ordered < 0)
+        services_.log.write(logLevelError, replaceFunction, "sync of %s failed: %s", place.c_str(),
+                            errorText(-ordered));
+    if (const auto moved = _moveItemAtURLToDeathRow(progress.stagingUrl, StartDeletionThread::no); !moved)
+        failed = makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
+                           LogFlag::yes, "Failed to remove staging dir: %s", progress.stagingUrl.c_str());
+    if (const auto moved = _moveItemAtURLToDeathRow(progress.journalUrl, startDeletionThread); !moved)
+        failed = makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
+                           LogFlag::yes, "Failed to remove replace file: %s", progress.journalUrl.c_str());
+    return failed;
+}
+
+Result<void> ZORClientConnection::_recoverFromReplaceOperationsWithError() {
+    const FileURL replace = services_.configuration.replaceDirectory();
+    const auto items = services_.fileManager.urlsForItemsInDirectoryAtURL(replace);
+    if (!items) {
+        if (!items.error().isPosix(ENOENT))
+            services_.log.write(logLevelError, recoverFunction, "Failed to get items at replace URL%s : %s",
+                                replace.c_str(), items.error().text().c_str());
+        return {};
+    }
+    for (const FileURL& item : *items)
+        TRY(recoverReplace(item));
+    return {};
+}
+
+Result<void> ZORClientConnection::recoverReplace(const FileURL& journalUrl) {
+    const Log& log = services_.log;
+    const Here here{recoverFunction, __LINE__};
+    ZORFileManager& fileManager = services_.fileManager;
+    const auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(log, fileManager, journalUrl);
+    if (journal) {
+        if (log.writes(logLevelDebug))
+            log.write(logLevelDebug, recoverFunction, "Doing a replace of %s with info: %s", journalUrl.c_str(),
+                      journal->text().c_str());
+        // What cannot be examined counts as there: a move onto it could not be undone.
+        const bool moveBack =
+            fileManager.itemDoesNotExistAtURL(journal->oldUrl) && fileManager.itemDoesNotExistAtURL(journal->destUrl);
+        if (moveBack && fileManager.itemDoesNotExistAtURL(journal->stagingUrl)) {
+            log.write(logLevelError, recoverFunction, "Nothing is left of the replace of %s", journalUrl.c_str());
+        } else if (moveBack) {
+            if (log.writes(logLevelDebug))
+                log.write(logLevelDebug, recoverFunction, "Recovering from failed replace by moving: %s to %s",
+                          journal->stagingUrl.c_str(), journal->oldUrl.c_str());
+            if (const auto moved = fileManager.moveItemAtURL(journal->stagingUrl, journal->oldUrl); !moved)
+                return makeError(log, here, ErrorCode::journalUnusable, &moved.error(), LogFlag::yes,
+                                 "Failed to recover replace move: %s to %s", journal->stagingUrl.c_str(),
+                                 journal->oldUrl.c_str());
+            const auto directory = fileManager.resolver().openDirectory(journal->oldUrl.deletingLastPathComponent());
+            const int ordered = directory ? services_.durability.beforeRemoval(directory->get()) : -directory.error();
+            if (ordered < 0)
+                return makeError(log, here, ErrorCode::replaceCleanUpFailed, nullptr, LogFlag::yes,
+                                 "Failed to remove replace file at %s", journalUrl.c_str());
+        }
+    }
+    if (const auto moved = _moveItemAtURLToDeathRow(journalUrl, StartDeletionThread::no); !moved)
+        return makeError(log, here, ErrorCode::replaceCleanUpFailed, &moved.error(), LogFlag::yes,
+                         "Failed to remove replace file at %s", journalUrl.c_str());
+    return {};
+}
+
+} // namespace zor

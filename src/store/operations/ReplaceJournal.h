@@ -1,0 +1,34 @@
+// SPDX-License-Identifier: Apache-2.0
+// The journal of one replace: what moves where. It is on the disk, whole, before the first move, and goes after the
+// last; so the next launch knows of each replace that was under way.
+//
+// Its name is a random UUID, which also names the place in staging where the old container waits meanwhile.
+#pragma once
+
+#include "daemon/base/FileURL.h"
+#include "daemon/base/Result.h"
+#include "daemon/base/UUID.h"
+#include "fs/ZORFileManager.h"
+
+namespace zor {
+
+struct ReplaceJournal {
+    FileURL oldUrl;     // the old container
+    FileURL newUrl;     // the new one, before the replace
+    FileURL stagingUrl; // where the old one waits
+    FileURL destUrl;    // where the new one ends up
+
+    /// "UUID.plist" in the Replace directory.
+    [[nodiscard]] static FileURL urlFor(const FileURL& replaceDirectory, const UUID& uuid);
+
+    /// Writes it durably, or nothing. Error 33 when an URL is missing, 34.
+    [[nodiscard]] Result<void> _writeToDiskReplaceAt(const Log& log, ZORFileManager& fileManager,
+                                                     const FileURL& url) const;
+    /// Error 35, logged, for a file that cannot be read or lacks a path.
+    [[nodiscard]] static Result<ReplaceJournal>
+    _readAndValidateReplaceFileAtUrl(const Log& log, ZORFileManager& fileManager, const FileURL& url);
+    /// For the log.
+    [[nodiscard]] std::string text() const;
+};
+
+} // namespace zor

@@ -1,0 +1,70 @@
+// SPDX-License-Identifier: Apache-2.0
+// Two repairs of a container: its standard subdirectories made again, and a new name for its directory.
+//
+// A stop leaves some subdirectories made, or the container under its old or its new name; a mapping that then points to
+// nothing is removed at the next launch.
+#include "daemon/ZORClientConnection.h"
+#include "store/StoreServices.h"
+#include "store/operations/ContainerLayout.h"
+
+#include <optional>
+
+namespace zor {
+
+Result<void> ZORClientConnection::recreateDefaultStructureForUser(const ContainerAddress& address) {
+    return services_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
+        constexpr const char* function = "recreateDefaultStructureForUser";
+        TRY(checkAddress(function, address));
+        const IdentifierLock lock(services_.locks, address.uuid->string(), LockMode::writing);
+        const auto record = TRY(knownContainer(function, address));
+        const FileURL container = record->url();
+        const ContainerLayout layout = layoutOf(address.containerClass, address.userId);
+        for (const char* subdirectory : layout.subdirectories) {
+            const auto made = services_.fileManager.createDirectoryAtURL(
+                container.appendingDirectory(subdirectory), Intermediates::yes,
+                {.mode = layout.subdirectoryMode, .owner = layout.subdirectoryOwner});
+            if (!made)
+                return makeError(services_.log, {"_createSubDirectories", __LINE__}, ErrorCode::subdirectoryFailed,
+                                 &made.error(), LogFlag::yes, "Failed to create sub-dir at %s%s", container.c_str(),
+                                 subdirectory);
+        }
+        return {};
+    });
+}
+
+Result<void> ZORClientConnection::regenerateDirectoryUUIDForUser(const ContainerAddress& address) {
+    return services_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
+        constexpr const char* function = "regenerateDirectoryUUIDForUser";
+        TRY(checkAddress(function, address));
+        FileURL place;
+        {
+            const IdentifierLock lock(services_.locks, address.uuid->string(), LockMode::writing);
+            const auto record = TRY(knownContainer(function, address));
+            const FileURL oldUrl = record->url();
+            place = oldUrl.deletingLastPathComponent();
+            const FileURL newUrl = place.appendingDirectory(UUID::random().string());
+            const auto moved = services_.fileManager.moveItemAtURL(oldUrl, newUrl);
+            if (!moved)
+                return makeError(services_.log, {function, __LINE__}, ErrorCode::directoryNotRenamed, &moved.error(),
+                                 LogFlag::yes, "Failed to move dir: %s to new UUID dir: %s", oldUrl.c_str(),
+                                 newUrl.c_str());
+            if (isPerUserClass(address.containerClass) &&
+                !_setSandboxContainerMappingForUser(address.userId, record->identifier(), address.containerClass,
+                                                    newUrl))
+                services_.log.write(logLevelError, function, "Failed to set container mapping in regenerate operation");
+            const bool transient = record->transient();
+            const auto added =
+                services_.cache.addContainerMetadata(record, address.userId, ContainerPlace(newUrl), transient);
+            if (!added)
+                return makeError(services_.log, {function, __LINE__}, ErrorCode::cacheAddFailed, &added.error(),
+                                 LogFlag::yes, "Failed to add to cache: %s, url: %s, transient: %d",
+                                 ZOR_SHOWN(record->identifier()), newUrl.c_str(), transient);
+        }
+        if (const auto failed = syncDirectories({place}))
+            return makeError(services_.log, {function, __LINE__}, ErrorCode::directoryNotRenamed, &*failed,
+                             LogFlag::yes, "Failed to move dir: %s to new UUID dir: %s", place.c_str(), place.c_str());
+        return {};
+    });
+}
+
+} // namespace zor
