@@ -54,6 +54,67 @@ startDaemon() {
     fail "the daemon does not answer"
 }
 
+# The same for a program that is run in a sandbox.
+run() {
+    printf '$ zorvane-run %s\n' "${*//$PWD\//}"
+    answer="$("$binaries/zorvane-run" --root "$root" "$@" 2>&1)" || fail "zorvane-run $* failed: $answer"
+    answer="${answer//$root\//}"
+    printf '%s\n' "${answer//$PWD\//}"
+}
+
+# Says why no sandbox can be made here; says nothing when one can.
+whyNoSandbox() {
+    local probe
+    if ((EUID != 0)); then
+        echo "only root can become other users"
+    elif [[ ! -x /usr/bin/bwrap ]]; then
+        echo "bubblewrap is not installed"
+    elif [[ "$root" == /usr/* || "$root" == /etc/* ]]; then
+        echo "the checkout lies where every sandbox sees it"
+    elif ! probe="$(bwrap --unshare-pid --unshare-ipc --unshare-uts --ro-bind / / --proc /proc --dev /dev true 2>&1)"; then
+        echo "namespaces are not allowed here (${probe%%$'\n'*})"
+    fi
+}
+
+# Two applications of user 501 that share a group, until both drop it.
+sandboxes() {
+    local program=(--user 501 --read-only "$PWD/tools/tour" --) shared diary lists
+    say "An installer registers what applications may share. zorvane-run, which a service manager calls, will ask for that."
+    sed "s|/usr/sbin/zorvane-run|$binaries/zorvane-run|" packaging/examples/zorvane-run.plist \
+        >"$root/etc/zorvane/zorvane-run.plist"
+    mv "$root"/etc/zorvane/{zorvane-run.plist,identities.d/}
+    ctl entitlements set org.example.notes --app-group group.org.example.household
+    ctl entitlements set org.example.lists --app-group group.org.example.household
+    run --identifier org.example.notes --dry-run "${program[@]}" "$PWD/tools/tour/notes"
+
+    say "Both run, each in a sandbox of its own: they meet in their group, and nowhere else."
+    run --identifier org.example.notes "${program[@]}" "$PWD/tools/tour/notes"
+    diary="$notes/Documents/diary.txt"
+    [[ "$(cat "$diary")" == "dear diary" && "$(stat -c %u "$diary")" == 501 ]] || fail "the diary is not there"
+    run --identifier org.example.lists "${program[@]}" "$PWD/tools/tour/lists" "$diary"
+    ctl lookup org.example.lists --class data-app --user 501
+    lists="$(pathInAnswer)"
+    echo "\$ zorvane-run --identifier org.example.notes --user 501 -- ls ${lists#"$root/"}"
+    if answer="$("$binaries/zorvane-run" --root "$root" --identifier org.example.notes "${program[@]}" ls "$lists" 2>&1)"; then
+        fail "notes sees the container of lists: $answer"
+    fi
+    echo "${answer//$root\//}"
+    ctl groups org.example.notes --user 501
+    shared="$(pathInAnswer)"
+    [[ "$(wc -l <"$shared/basket.txt")" == 2 ]] || fail "the basket does not hold what both put into it"
+
+    say "Who holds the group? It goes with the last one."
+    ctl why org.example.notes
+    ctl entitlements set org.example.lists --app-group group.org.example.other
+    [[ -e "$shared/basket.txt" ]] || fail "the group's container went though notes holds the group"
+    ctl why org.example.notes
+    ctl entitlements set org.example.notes --app-group group.org.example.other
+    [[ ! -e "$shared" ]] || fail "the group's container stays though nobody holds the group"
+    grep "Last reference to group container group.org.example.household" "$log" | tail -n 1
+    ctl empty-death-row
+    [[ -z "$(find "$root" -name basket.txt)" ]] || fail "the basket is still somewhere"
+}
+
 # What lies below a folder of the root, indented by depth, directories with a slash.
 tree() {
     (cd "$root" && find "$1" -mindepth 1 \( -type d -printf '%P/\n' \) -o -printf '%P\n') | LC_ALL=C sort |
@@ -121,6 +182,12 @@ ctl create org.example.scratch --class data-app --user 501 --transient
 say "Death row is emptied in the background. This waits until it is."
 ctl empty-death-row
 [[ -z "$(ls -A "$root/private/var/root/Library/Caches/com.veltra.zorvaned/Dead")" ]] || fail "death row is not empty"
+
+if [[ -n "$(whyNoSandbox)" ]]; then
+    say "Here two applications would run in sandboxes. This part is left out: $(whyNoSandbox)."
+else
+    sandboxes
+fi
 
 say "What lies on disk now (private/var):"
 tree private/var
