@@ -15,6 +15,8 @@ std::vector<Figure> measureLookup(const Settings& settings);
 std::vector<Figure> measureRegistration(const Settings& settings);
 /// Many do: ThroughputBench.cc.
 std::vector<Figure> measureThroughput(const Settings& settings);
+/// The kernel's agent asks for the containers of a process: UpcallBench.cc.
+std::vector<Figure> measureUpcall(const Settings& settings);
 /// Containers are made: CreateBench.cc.
 std::vector<Figure> measureCreate(const Settings& settings);
 /// The first look into a class with many containers: ClassBench.cc.

@@ -28,8 +28,8 @@ constexpr const char* help =
 Measures the daemon beside this program and prints each figure with its goal.
 
   --quick       fewer repetitions and smaller stores; under a minute
-  --only NAME   one group: lookup, registration, throughput, create, class, start,
-                endurance
+  --only NAME   one group: lookup, registration, throughput, upcall, create, class,
+                start, endurance
   --json FILE   write the figures to FILE, too
 
 As root it measures on file systems made for the run; others use a directory.
@@ -47,9 +47,9 @@ struct Group {
 };
 constexpr Group groups[] = {
     {"lookup", measureLookup},         {"registration", measureRegistration},
-    {"throughput", measureThroughput}, {"create", measureCreate},
-    {"class", measureClass},           {"start", measureStart},
-    {"endurance", measureEndurance},
+    {"throughput", measureThroughput}, {"upcall", measureUpcall},
+    {"create", measureCreate},         {"class", measureClass},
+    {"start", measureStart},           {"endurance", measureEndurance},
 };
 
 [[noreturn]] void endWithUsage(const std::string& what) {
