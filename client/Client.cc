@@ -102,6 +102,15 @@ void setIdentifier(plist::Dictionary& message, const std::string& identifier) {
         message.set(keys::identifier, identifier);
 }
 
+plist::Dictionary addressed(ipc::Command command, const Client::Address& address) {
+    plist::Dictionary message = request(command);
+    message.set(keys::containerClass, address.containerClass);
+    message.set(keys::userId, address.user);
+    message.set(keys::identifier, address.identifier);
+    message.set(keys::uuid, ipc::uuidValue(address.uuid));
+    return message;
+}
+
 Result<void> withoutContent(const Result<plist::Dictionary>& reply) {
     if (!reply)
         return std::unexpected(reply.error());
@@ -229,16 +238,16 @@ Result<void> Client::emptyDeathRow() {
     return withoutContent(connection_->call(request(ipc::Command::deleteContainersOnDeathRow)));
 }
 
-Result<void> Client::stageForDelete(const std::vector<Deletion>& deletions) {
+Result<void> Client::stageForDelete(const std::vector<Address>& containers) {
     plist::Array classes;
     plist::Array users;
     plist::Array identifiers;
     plist::Array uuids;
-    for (const Deletion& deletion : deletions) {
-        classes.emplace_back(deletion.containerClass);
-        users.emplace_back(deletion.user);
-        identifiers.emplace_back(deletion.identifier);
-        uuids.push_back(ipc::uuidValue(deletion.uuid));
+    for (const Address& container : containers) {
+        classes.emplace_back(container.containerClass);
+        users.emplace_back(container.user);
+        identifiers.emplace_back(container.identifier);
+        uuids.push_back(ipc::uuidValue(container.uuid));
     }
     plist::Dictionary message = request(ipc::Command::stageContainersForDelete);
     message.set(keys::containerClassesArray, std::move(classes));
@@ -256,6 +265,81 @@ Result<void> Client::deleteContainer(std::uint64_t containerClass, std::uint32_t
     message.set(keys::identifier, identifier);
     message.set(keys::transient, transient);
     return withoutContent(connection_->call(message));
+}
+
+Result<void> Client::replace(const std::optional<Address>& old, const Address& fresh) {
+    plist::Dictionary message = request(ipc::Command::replaceContainer);
+    if (old) {
+        message.set(keys::oldContainerClass, old->containerClass);
+        message.set(keys::oldContainerUserId, old->user);
+        message.set(keys::oldIdentifier, old->identifier);
+        message.set(keys::oldContainerUUID, ipc::uuidValue(old->uuid));
+    }
+    message.set(keys::newContainerClass, fresh.containerClass);
+    message.set(keys::newContainerUserId, fresh.user);
+    message.set(keys::newIdentifier, fresh.identifier);
+    message.set(keys::newContainerUUID, ipc::uuidValue(fresh.uuid));
+    return withoutContent(connection_->call(message));
+}
+
+Result<void> Client::wipe(std::uint64_t containerClass, std::uint32_t user, const std::string& identifier) {
+    plist::Dictionary message = request(ipc::Command::wipeDataContainerContent);
+    message.set(keys::containerClass, containerClass);
+    message.set(keys::userId, user);
+    message.set(keys::identifier, identifier);
+    return withoutContent(connection_->call(message));
+}
+
+Result<Client::Metadata> Client::metadata(const Address& address) {
+    plist::Dictionary message = addressed(ipc::Command::getMetadata, address);
+    message.set(keys::infoDictRequested, true);
+    const auto reply = connection_->call(message);
+    if (!reply)
+        return std::unexpected(reply.error());
+    const std::string* path = reply->string(keys::replyPath);
+    if (!path)
+        return incomplete();
+    const plist::Dictionary* info = reply->dictionary(keys::replyInfoDictionary);
+    return Metadata{
+        .path = *path, .transient = reply->isTrue(keys::replyTransient), .info = info ? converted(*info) : Map()};
+}
+
+Result<Value> Client::infoValue(const Address& address, const std::string& key) {
+    plist::Dictionary message = addressed(ipc::Command::getInfoValue, address);
+    message.set(keys::key, key);
+    const auto reply = connection_->call(message);
+    if (!reply)
+        return std::unexpected(reply.error());
+    const plist::Value* value = reply->find(keys::replyInfoValue);
+    if (!value)
+        return incomplete();
+    return converted(*value);
+}
+
+Result<void> Client::setInfoValue(const Address& address, const std::string& key, const std::optional<Value>& value) {
+    plist::Dictionary message = addressed(ipc::Command::setInfoValue, address);
+    message.set(keys::key, key);
+    if (value)
+        message.set(keys::value, unconverted(*value));
+    return withoutContent(connection_->call(message));
+}
+
+Result<void> Client::recreateDefaultStructure(const Address& address) {
+    return withoutContent(connection_->call(addressed(ipc::Command::recreateDefaultStructure, address)));
+}
+
+Result<void> Client::regenerateDirectoryUUID(const Address& address) {
+    return withoutContent(connection_->call(addressed(ipc::Command::regenerateDirectoryUUID, address)));
+}
+
+Result<std::uint64_t> Client::diskUsage(const Address& address) {
+    const auto reply = connection_->call(addressed(ipc::Command::getDiskUsage, address));
+    if (!reply)
+        return std::unexpected(reply.error());
+    const auto bytes = reply->unsignedInteger(keys::replyDiskUsage);
+    if (!bytes)
+        return incomplete();
+    return *bytes;
 }
 
 Result<Client::GroupPaths> Client::groupContainerPaths(std::uint32_t user, const std::string& identifier) {

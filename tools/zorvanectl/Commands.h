@@ -20,15 +20,35 @@ struct Target {
     bool transient = false;
 };
 
+/// Whether what destroys something is done: asked on a terminal, or said beforehand with --yes.
+enum class Consent { ask, given };
+
 // ContainerCommands.cc
 int create(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
 int lookup(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
 int list(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
 /// Those of a class; all of them are there, or none goes.
 int deleteContainers(const zorvane::ConnectOptions& connect, const Output& output, const Target& target,
-                     const std::vector<std::string>& identifiers);
+                     const std::vector<std::string>& identifiers, Consent consent);
 int emptyDeathRow(const zorvane::ConnectOptions& connect, const Output& output);
 int status(const zorvane::ConnectOptions& connect, const Output& output);
+
+// KnownContainerCommands.cc: a container that is there.
+/// Puts the transient container of an identifier in the place of its live one, or makes it that one.
+int replace(const zorvane::ConnectOptions& connect, const Output& output, const Target& target, Consent consent);
+int wipe(const zorvane::ConnectOptions& connect, const Output& output, const Target& target, Consent consent);
+int metadata(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
+int repair(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
+int regenerate(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
+/// Without an identifier, all of the class.
+int usage(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
+int infoList(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
+int infoGet(const zorvane::ConnectOptions& connect, const Output& output, const Target& target, const std::string& key);
+/// `value` is JSON; what is no JSON is taken as a string.
+int infoSet(const zorvane::ConnectOptions& connect, const Output& output, const Target& target, const std::string& key,
+            const std::string& value);
+int infoUnset(const zorvane::ConnectOptions& connect, const Output& output, const Target& target,
+              const std::string& key);
 
 // EntitlementCommands.cc
 struct Registration {

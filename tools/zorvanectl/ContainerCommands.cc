@@ -84,7 +84,7 @@ int list(const zorvane::ConnectOptions& connect, const Output& output, const Tar
 }
 
 int deleteContainers(const zorvane::ConnectOptions& connect, const Output& output, const Target& target,
-                     const std::vector<std::string>& identifiers) {
+                     const std::vector<std::string>& identifiers, Consent consent) {
     const std::string what = "delete from " + std::string(zorvane::containerClassName(target.containerClass));
     auto client = zorvane::Client::connect(connect);
     if (!client)
@@ -92,7 +92,7 @@ int deleteContainers(const zorvane::ConnectOptions& connect, const Output& outpu
     const auto containers = client->list(target.containerClass, userOf(target), target.transient);
     if (!containers)
         return output.error(containers.error(), what);
-    std::vector<zorvane::Client::Deletion> deletions;
+    std::vector<zorvane::Client::Address> deletions;
     for (const std::string& identifier : identifiers) {
         const auto found = std::ranges::find(*containers, identifier, &zorvane::ListedContainer::identifier);
         if (found == containers->end())
@@ -106,6 +106,13 @@ int deleteContainers(const zorvane::ConnectOptions& connect, const Output& outpu
                              .identifier = identifier,
                              .uuid = found->uuid});
     }
+    std::uint64_t bytes = 0;
+    for (const auto& deletion : deletions)
+        bytes += client->diskUsage(deletion).value_or(0);
+    const std::string amount = std::to_string(deletions.size()) +
+                               (deletions.size() == 1 ? " container" : " containers") + ", " + shownBytes(bytes);
+    if (consent == Consent::ask && !output.agreed("Delete " + amount + "?"))
+        return exitUsage;
     if (const auto staged = client->stageForDelete(deletions); !staged)
         return output.error(staged.error(), what);
     nlohmann::json rows = nlohmann::json::array();
@@ -115,7 +122,9 @@ int deleteContainers(const zorvane::ConnectOptions& connect, const Output& outpu
             output.line(printable(deletion.identifier) + " deleted");
     }
     if (output.isJson())
-        output.json(rows);
+        output.json({{"deleted", rows}, {"bytes", bytes}});
+    else
+        output.line(amount);
     return exitDone;
 }
 

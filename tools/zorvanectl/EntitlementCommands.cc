@@ -9,41 +9,6 @@ namespace zorvanectl {
 
 namespace {
 
-/// nullopt for what entitlements cannot hold.
-std::optional<zorvane::Value> fromJson(const nlohmann::json& json) {
-    zorvane::Value value;
-    if (json.is_boolean()) {
-        value.content = json.get<bool>();
-    } else if (json.is_number_unsigned()) {
-        value.content = json.get<std::uint64_t>();
-    } else if (json.is_number_integer()) {
-        value.content = json.get<std::int64_t>();
-    } else if (json.is_number_float()) {
-        value.content = json.get<double>();
-    } else if (json.is_string()) {
-        value.content = json.get<std::string>();
-    } else if (json.is_array()) {
-        zorvane::List& list = value.content.emplace<zorvane::List>();
-        for (const auto& element : json) {
-            auto converted = fromJson(element);
-            if (!converted)
-                return std::nullopt;
-            list.push_back(std::move(*converted));
-        }
-    } else if (json.is_object()) {
-        zorvane::Map& map = value.content.emplace<zorvane::Map>();
-        for (const auto& [key, element] : json.items()) {
-            auto converted = fromJson(element);
-            if (!converted)
-                return std::nullopt;
-            map.emplace(key, std::move(*converted));
-        }
-    } else {
-        return std::nullopt;
-    }
-    return value;
-}
-
 /// Everything that a file holds; nullopt when it cannot be read.
 std::optional<std::string> contentOf(const std::string& file) {
     std::FILE* input = file == "-" ? stdin : std::fopen(file.c_str(), "re");

@@ -3,6 +3,8 @@
 
 #include <algorithm>
 #include <cstdio>
+#include <iterator>
+#include <unistd.h>
 
 namespace zorvanectl {
 
@@ -113,6 +115,16 @@ void Output::tree(const std::string& name, const zorvane::Value& value, const st
         tree(key, element, indent + "  ");
 }
 
+bool Output::agreed(const std::string& question) const {
+    if (isJson() || ::isatty(STDIN_FILENO) == 0 || ::isatty(STDERR_FILENO) == 0) {
+        std::fprintf(stderr, "zorvanectl: %s Nothing was done: say --yes to have it done.\n", question.c_str());
+        return false;
+    }
+    std::fprintf(stderr, "%s [y/N] ", question.c_str());
+    const int answer = std::getchar();
+    return answer == 'y' || answer == 'Y';
+}
+
 int Output::error(const zorvane::Error& error, const std::string& while_) const {
     const int exitCode = exitCodeOf(error);
     if (isJson()) {
@@ -131,6 +143,51 @@ int Output::error(const zorvane::Error& error, const std::string& while_) const 
     std::fprintf(stderr, "zorvanectl: %s: %s%s\n  What to do: %s.\n", printable(while_).c_str(), error.message.c_str(),
                  code.c_str(), adviceFor(error));
     return exitCode;
+}
+
+std::optional<zorvane::Value> fromJson(const nlohmann::json& json) {
+    zorvane::Value value;
+    if (json.is_boolean()) {
+        value.content = json.get<bool>();
+    } else if (json.is_number_unsigned()) {
+        value.content = json.get<std::uint64_t>();
+    } else if (json.is_number_integer()) {
+        value.content = json.get<std::int64_t>();
+    } else if (json.is_number_float()) {
+        value.content = json.get<double>();
+    } else if (json.is_string()) {
+        value.content = json.get<std::string>();
+    } else if (json.is_array()) {
+        zorvane::List& list = value.content.emplace<zorvane::List>();
+        for (const auto& element : json) {
+            auto converted = fromJson(element);
+            if (!converted)
+                return std::nullopt;
+            list.push_back(std::move(*converted));
+        }
+    } else if (json.is_object()) {
+        zorvane::Map& map = value.content.emplace<zorvane::Map>();
+        for (const auto& [key, element] : json.items()) {
+            auto converted = fromJson(element);
+            if (!converted)
+                return std::nullopt;
+            map.emplace(key, std::move(*converted));
+        }
+    } else {
+        return std::nullopt;
+    }
+    return value;
+}
+
+std::string shownBytes(std::uint64_t bytes) {
+    static constexpr const char* units[] = {"bytes", "KiB", "MiB", "GiB", "TiB"};
+    auto shown = static_cast<double>(bytes);
+    std::size_t unit = 0;
+    for (; shown >= 1024 && unit + 1 < std::size(units); ++unit)
+        shown /= 1024;
+    char text[32];
+    std::snprintf(text, sizeof text, unit == 0 ? "%.0f %s" : "%.1f %s", shown, units[unit]);
+    return text;
 }
 
 nlohmann::json toJson(const zorvane::Value& value) {

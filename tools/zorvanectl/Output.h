@@ -5,7 +5,9 @@
 
 #include "zorvane/Client.h"
 
+#include <cstdint>
 #include <nlohmann/json.hpp>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -31,6 +33,8 @@ public:
     void table(const std::vector<std::string>& header, const std::vector<std::vector<std::string>>& rows) const;
     /// A name and what is under it, a line each, deeper ones indented.
     void tree(const std::string& name, const zorvane::Value& value, const std::string& indent = "") const;
+    /// Asks on the terminal whether to go on. Where there is none, or for JSON, no: said on standard error.
+    [[nodiscard]] bool agreed(const std::string& question) const;
     /// Says what failed, what that means and what to do. The exit code for it.
     [[nodiscard]] int error(const zorvane::Error& error, const std::string& while_) const;
 
@@ -39,6 +43,10 @@ private:
 };
 
 [[nodiscard]] nlohmann::json toJson(const zorvane::Value& value);
+/// nullopt for null, and for what holds it: the daemon's values have none.
+[[nodiscard]] std::optional<zorvane::Value> fromJson(const nlohmann::json& json);
+/// "1.4 MiB".
+[[nodiscard]] std::string shownBytes(std::uint64_t bytes);
 /// Control characters shown as \xNN, so that a name cannot steer the terminal.
 [[nodiscard]] std::string printable(const std::string& text);
 

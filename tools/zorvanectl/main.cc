@@ -37,6 +37,9 @@ struct Arguments {
     std::uint32_t user = 0;
     Target target;
     std::vector<std::string> identifiers;
+    std::string key;
+    std::string value;
+    bool yes = false;
     std::string group;
     Registration registration;
 };
@@ -62,6 +65,10 @@ void finishTarget(const CLI::App& command, Arguments& arguments) {
         arguments.target.user = arguments.user;
 }
 
+Consent consentOf(const Arguments& arguments) {
+    return arguments.yes ? Consent::given : Consent::ask;
+}
+
 /// What the command line asks for, to be done once it is parsed as a whole.
 using Action = std::function<int(const Output&)>;
 
@@ -85,17 +92,67 @@ void addContainerCommands(CLI::App& app, Arguments& arguments, Action& action) {
         command->add_option("identifier", arguments.target.identifier, "Identifier; without it, this program's own");
     CLI::App* list = make("list", "List the containers of a class",
                           [](const Arguments& a, const Output& o) { return zorvanectl::list(a.connect, o, a.target); });
-    CLI::App* remove = make("delete", "Delete containers of a class: all those named, or none",
-                            [](const Arguments& a, const Output& o) {
-                                return zorvanectl::deleteContainers(a.connect, o, a.target, a.identifiers);
-                            });
+    CLI::App* remove = make(
+        "delete", "Delete containers of a class: all those named, or none", [](const Arguments& a, const Output& o) {
+            return zorvanectl::deleteContainers(a.connect, o, a.target, a.identifiers, consentOf(a));
+        });
     remove->add_option("identifiers", arguments.identifiers, "Identifiers")->required();
+    remove->add_flag("-y,--yes", arguments.yes, "Do not ask");
     for (CLI::App* command : {create, lookup, list, remove})
         addTargetOptions(*command, arguments);
     make("empty-death-row", "Delete what waits for deletion, and wait for it",
          [](const Arguments& a, const Output& o) { return zorvanectl::emptyDeathRow(a.connect, o); });
     make("status", "Show whom the daemon takes this program for, and how it is doing",
          [](const Arguments& a, const Output& o) { return zorvanectl::status(a.connect, o); });
+}
+
+void addKnownContainerCommands(CLI::App& app, Arguments& arguments, Action& action) {
+    using Run = int (*)(const Arguments&, const Output&);
+    const auto make = [&](CLI::App& above, const char* name, const char* help, Run run,
+                          bool identifierRequired = true) {
+        CLI::App* command = above.add_subcommand(name, help);
+        command->add_option("identifier", arguments.target.identifier, "Identifier")->required(identifierRequired);
+        addTargetOptions(*command, arguments);
+        command->callback([&arguments, &action, command, run] {
+            finishTarget(*command, arguments);
+            action = [&arguments, run](const Output& output) { return run(arguments, output); };
+        });
+        return command;
+    };
+    CLI::App* replace = make(
+        app, "replace", "Put an identifier's transient container in the place of its live one",
+        [](const Arguments& a, const Output& o) { return zorvanectl::replace(a.connect, o, a.target, consentOf(a)); });
+    CLI::App* wipe =
+        make(app, "wipe", "Empty a data container; its path and UUID stay", [](const Arguments& a, const Output& o) {
+            return zorvanectl::wipe(a.connect, o, a.target, consentOf(a));
+        });
+    for (CLI::App* command : {replace, wipe})
+        command->add_flag("-y,--yes", arguments.yes, "Do not ask");
+    make(app, "metadata", "Show a container's record",
+         [](const Arguments& a, const Output& o) { return zorvanectl::metadata(a.connect, o, a.target); });
+    make(app, "repair", "Make a container's standard subdirectories again",
+         [](const Arguments& a, const Output& o) { return zorvanectl::repair(a.connect, o, a.target); });
+    make(app, "regenerate", "Give a container's directory a new name",
+         [](const Arguments& a, const Output& o) { return zorvanectl::regenerate(a.connect, o, a.target); });
+    make(
+        app, "usage", "Measure a container, or all of a class",
+        [](const Arguments& a, const Output& o) { return zorvanectl::usage(a.connect, o, a.target); }, false);
+    CLI::App* info = app.add_subcommand("info", "Values attached to a container");
+    info->require_subcommand(1);
+    make(*info, "list", "All of them",
+         [](const Arguments& a, const Output& o) { return zorvanectl::infoList(a.connect, o, a.target); });
+    CLI::App* get = make(*info, "get", "One of them", [](const Arguments& a, const Output& o) {
+        return zorvanectl::infoGet(a.connect, o, a.target, a.key);
+    });
+    CLI::App* set = make(*info, "set", "Set one", [](const Arguments& a, const Output& o) {
+        return zorvanectl::infoSet(a.connect, o, a.target, a.key, a.value);
+    });
+    CLI::App* unset = make(*info, "unset", "Remove one", [](const Arguments& a, const Output& o) {
+        return zorvanectl::infoUnset(a.connect, o, a.target, a.key);
+    });
+    for (CLI::App* command : {get, set, unset})
+        command->add_option("key", arguments.key, "Key")->required();
+    set->add_option("value", arguments.value, "JSON; what is none is taken as a string")->required();
 }
 
 void addEntitlementCommands(CLI::App& app, Arguments& arguments, Action& action) {
@@ -176,6 +233,7 @@ int main(int argumentCount, char** argumentValues) {
     app.fallthrough();
     app.footer(footer);
     addContainerCommands(app, arguments, action);
+    addKnownContainerCommands(app, arguments, action);
     addEntitlementCommands(app, arguments, action);
     addGroupCommands(app, arguments, action);
     try {

@@ -85,17 +85,42 @@ public:
     /// Code 21: there is none, and it was not to be made.
     [[nodiscard]] Result<Container> createOrLookup(const Lookup& lookup);
 
-    struct Deletion {
+    /// One container, as list and createOrLookup name it.
+    struct Address {
         std::uint64_t containerClass = 0;
         std::uint32_t user = currentMobileUser;
         std::string identifier;
         std::array<std::uint8_t, 16> uuid{};
     };
     /// Takes containers out of the store; their files go when death row is emptied. What is not there is skipped.
-    [[nodiscard]] Result<void> stageForDelete(const std::vector<Deletion>& deletions);
+    [[nodiscard]] Result<void> stageForDelete(const std::vector<Address>& containers);
     /// The same for the one container of an identifier. Code 21: there is none.
     [[nodiscard]] Result<void> deleteContainer(std::uint64_t containerClass, std::uint32_t user,
                                                const std::string& identifier, bool transient);
+
+    /// Puts the second container in the place of the first, which goes. Without a first one, the second, a transient
+    /// one, becomes the live container of its identifier. Code 27: that one exists already.
+    [[nodiscard]] Result<void> replace(const std::optional<Address>& old, const Address& fresh);
+    /// Empties a data container: path and UUID stay.
+    [[nodiscard]] Result<void> wipe(std::uint64_t containerClass, std::uint32_t user, const std::string& identifier);
+
+    struct Metadata {
+        std::string path;
+        bool transient = false;
+        Map info;
+    };
+    [[nodiscard]] Result<Metadata> metadata(const Address& address);
+    /// Code 24: there is no such key.
+    [[nodiscard]] Result<Value> infoValue(const Address& address, const std::string& key);
+    /// Without a value the key is removed.
+    [[nodiscard]] Result<void> setInfoValue(const Address& address, const std::string& key,
+                                            const std::optional<Value>& value);
+    /// Makes the standard subdirectories again.
+    [[nodiscard]] Result<void> recreateDefaultStructure(const Address& address);
+    /// Gives the directory a new name; the UUID stays.
+    [[nodiscard]] Result<void> regenerateDirectoryUUID(const Address& address);
+    /// Bytes on the disk.
+    [[nodiscard]] Result<std::uint64_t> diskUsage(const Address& address);
 
     // Shared containers. An empty identifier is the caller's own; paths are of containers that are made when they are
     // first asked for.

@@ -1,0 +1,273 @@
+// SPDX-License-Identifier: Apache-2.0
+// What is done with a container that is there: replacing, wiping, repairing, measuring it, and its info values.
+#include "Commands.h"
+
+#include <algorithm>
+
+namespace zorvanectl {
+
+namespace {
+
+using zorvane::Client;
+
+constexpr std::uint64_t codeNotFound = 21;
+
+std::uint32_t userOf(const Target& target) {
+    return target.user.value_or(zorvane::defaultUserOfClass(target.containerClass));
+}
+
+std::string named(const Target& target) {
+    return target.identifier + " in " + std::string(zorvane::containerClassName(target.containerClass));
+}
+
+/// The address of a container, by its identifier. Asking for it otherwise would discard a transient one.
+zorvane::Result<Client::Address> find(Client& client, const Target& target, bool transient) {
+    const auto containers = client.list(target.containerClass, userOf(target), transient);
+    if (!containers)
+        return std::unexpected(containers.error());
+    const auto found = std::ranges::find(*containers, target.identifier, &zorvane::ListedContainer::identifier);
+    if (found == containers->end())
+        return std::unexpected(zorvane::Error{.kind = zorvane::Error::Kind::daemon,
+                                              .code = codeNotFound,
+                                              .message = std::string("there is no ") +
+                                                         (transient ? "transient" : "live") +
+                                                         " container of this identifier"});
+    return Client::Address{.containerClass = target.containerClass,
+                           .user = userOf(target),
+                           .identifier = target.identifier,
+                           .uuid = found->uuid};
+}
+
+/// Connects, finds the container, and does with it what is to be done.
+template <typename Body>
+int withContainer(const zorvane::ConnectOptions& connect, const Output& output, const Target& target,
+                  const std::string& what, Body&& body) {
+    auto client = Client::connect(connect);
+    if (!client)
+        return output.error(client.error(), what);
+    const auto address = find(*client, target, target.transient);
+    if (!address)
+        return output.error(address.error(), what);
+    return body(*client, *address);
+}
+
+int done(const zorvane::Result<void>& result, const Output& output, const std::string& what, const Target& target,
+         const char* verb) {
+    if (!result)
+        return output.error(result.error(), what);
+    if (output.isJson())
+        output.json({{"identifier", target.identifier}, {"class", target.containerClass}, {verb, true}});
+    else
+        output.line(printable(target.identifier) + " " + verb);
+    return exitDone;
+}
+
+/// What goes for good, with its size; nullopt when that is not agreed to.
+std::optional<std::uint64_t> agreedBytes(Client& client, const Client::Address& address, const Output& output,
+                                         const std::string& verb, Consent consent) {
+    const std::uint64_t bytes = client.diskUsage(address).value_or(0);
+    const std::string question = verb + " " + shownBytes(bytes) + " of " + printable(address.identifier) + "?";
+    if (consent == Consent::ask && !output.agreed(question))
+        return std::nullopt;
+    return bytes;
+}
+
+int destroyed(const zorvane::Result<void>& result, const Output& output, const std::string& what, const Target& target,
+              const char* verb, std::uint64_t bytes) {
+    if (!result)
+        return output.error(result.error(), what);
+    if (output.isJson())
+        output.json(
+            {{"identifier", target.identifier}, {"class", target.containerClass}, {verb, true}, {"bytes", bytes}});
+    else
+        output.line(printable(target.identifier) + " " + verb + ", " + shownBytes(bytes) + " went");
+    return exitDone;
+}
+
+void printUsage(const Output& output, std::vector<std::pair<std::string, std::uint64_t>> rows) {
+    constexpr std::uint64_t barWidth = 40;
+    std::ranges::sort(rows, std::greater<>(), &std::pair<std::string, std::uint64_t>::second);
+    if (output.isJson()) {
+        nlohmann::json json = nlohmann::json::array();
+        for (const auto& [identifier, bytes] : rows)
+            json.push_back({{"identifier", identifier}, {"bytes", bytes}});
+        output.json(json);
+        return;
+    }
+    const std::uint64_t most = rows.empty() ? 0 : std::max<std::uint64_t>(rows.front().second, 1);
+    std::vector<std::vector<std::string>> table;
+    for (const auto& [identifier, bytes] : rows) {
+        const auto width = static_cast<double>(bytes) / static_cast<double>(most) * static_cast<double>(barWidth);
+        table.push_back({printable(identifier), shownBytes(bytes), std::string(static_cast<std::size_t>(width), '#')});
+    }
+    output.table({"IDENTIFIER", "SIZE", ""}, table);
+}
+
+} // namespace
+
+int replace(const zorvane::ConnectOptions& connect, const Output& output, const Target& target, Consent consent) {
+    const std::string what = "replace " + named(target);
+    auto client = Client::connect(connect);
+    if (!client)
+        return output.error(client.error(), what);
+    const auto fresh = find(*client, target, true);
+    if (!fresh)
+        return output.error(fresh.error(), what);
+    const auto old = find(*client, target, false);
+    if (!old && old.error().code != codeNotFound)
+        return output.error(old.error(), what);
+    std::uint64_t bytes = 0;
+    if (old) {
+        const auto agreed = agreedBytes(*client, *old, output, "Replace", consent);
+        if (!agreed)
+            return exitUsage;
+        bytes = *agreed;
+    }
+    return destroyed(client->replace(old ? std::optional(*old) : std::nullopt, *fresh), output, what, target,
+                     "replaced", bytes);
+}
+
+int wipe(const zorvane::ConnectOptions& connect, const Output& output, const Target& target, Consent consent) {
+    const std::string what = "wipe " + named(target);
+    return withContainer(connect, output, target, what, [&](Client& client, const Client::Address& address) {
+        const auto bytes = agreedBytes(client, address, output, "Wipe", consent);
+        if (!bytes)
+            return exitUsage;
+        return destroyed(client.wipe(address.containerClass, address.user, address.identifier), output, what, target,
+                         "wiped", *bytes);
+    });
+}
+
+int metadata(const zorvane::ConnectOptions& connect, const Output& output, const Target& target) {
+    const std::string what = "show the metadata of " + named(target);
+    return withContainer(connect, output, target, what, [&](Client& client, const Client::Address& address) {
+        const auto found = client.metadata(address);
+        if (!found)
+            return output.error(found.error(), what);
+        if (output.isJson()) {
+            output.json({{"identifier", address.identifier},
+                         {"uuid", zorvane::uuidText(address.uuid)},
+                         {"class", address.containerClass},
+                         {"path", found->path},
+                         {"transient", found->transient},
+                         {"info", toJson({found->info})}});
+            return exitDone;
+        }
+        output.line(printable(address.identifier));
+        output.line("  uuid       " + zorvane::uuidText(address.uuid));
+        output.line("  path       " + printable(found->path));
+        output.line(std::string("  transient  ") + (found->transient ? "yes" : "no"));
+        for (const auto& [key, value] : found->info)
+            output.tree(key, value, "  ");
+        return exitDone;
+    });
+}
+
+int repair(const zorvane::ConnectOptions& connect, const Output& output, const Target& target) {
+    const std::string what = "repair " + named(target);
+    return withContainer(connect, output, target, what, [&](Client& client, const Client::Address& address) {
+        return done(client.recreateDefaultStructure(address), output, what, target, "repaired");
+    });
+}
+
+int regenerate(const zorvane::ConnectOptions& connect, const Output& output, const Target& target) {
+    const std::string what = "rename the directory of " + named(target);
+    return withContainer(connect, output, target, what, [&](Client& client, const Client::Address& address) {
+        if (const auto renamed = client.regenerateDirectoryUUID(address); !renamed)
+            return output.error(renamed.error(), what);
+        const auto found = client.metadata(address);
+        if (!found)
+            return output.error(found.error(), what);
+        if (output.isJson())
+            output.json({{"identifier", address.identifier}, {"path", found->path}});
+        else
+            output.line(printable(address.identifier) + " is now at " + printable(found->path));
+        return exitDone;
+    });
+}
+
+int usage(const zorvane::ConnectOptions& connect, const Output& output, const Target& target) {
+    const std::string what = "measure " + std::string(zorvane::containerClassName(target.containerClass));
+    auto client = Client::connect(connect);
+    if (!client)
+        return output.error(client.error(), what);
+    const auto containers = client->list(target.containerClass, userOf(target), target.transient);
+    if (!containers)
+        return output.error(containers.error(), what);
+    std::vector<std::pair<std::string, std::uint64_t>> rows;
+    for (const auto& container : *containers) {
+        if (!target.identifier.empty() && container.identifier != target.identifier)
+            continue;
+        const auto bytes = client->diskUsage({.containerClass = target.containerClass,
+                                              .user = userOf(target),
+                                              .identifier = container.identifier,
+                                              .uuid = container.uuid});
+        // One that has gone since it was listed is no longer there to be measured.
+        if (!bytes && bytes.error().code != codeNotFound)
+            return output.error(bytes.error(), what);
+        if (bytes)
+            rows.emplace_back(container.identifier, *bytes);
+    }
+    if (rows.empty() && !target.identifier.empty())
+        return output.error({.kind = zorvane::Error::Kind::daemon,
+                             .code = codeNotFound,
+                             .message = "there is no container of this identifier"},
+                            "measure " + named(target));
+    printUsage(output, std::move(rows));
+    return exitDone;
+}
+
+int infoList(const zorvane::ConnectOptions& connect, const Output& output, const Target& target) {
+    const std::string what = "list the info of " + named(target);
+    return withContainer(connect, output, target, what, [&](Client& client, const Client::Address& address) {
+        const auto found = client.metadata(address);
+        if (!found)
+            return output.error(found.error(), what);
+        if (output.isJson()) {
+            output.json(toJson({found->info}));
+            return exitDone;
+        }
+        for (const auto& [key, value] : found->info)
+            output.tree(key, value);
+        return exitDone;
+    });
+}
+
+int infoGet(const zorvane::ConnectOptions& connect, const Output& output, const Target& target,
+            const std::string& key) {
+    const std::string what = "get " + key + " of " + named(target);
+    return withContainer(connect, output, target, what, [&](Client& client, const Client::Address& address) {
+        const auto value = client.infoValue(address, key);
+        if (!value)
+            return output.error(value.error(), what);
+        if (output.isJson())
+            output.json(toJson(*value));
+        else
+            output.tree(key, *value);
+        return exitDone;
+    });
+}
+
+int infoSet(const zorvane::ConnectOptions& connect, const Output& output, const Target& target, const std::string& key,
+            const std::string& value) {
+    const std::string what = "set " + key + " of " + named(target);
+    const auto json = nlohmann::json::parse(value, nullptr, false);
+    auto parsed = json.is_discarded() ? std::optional(zorvane::Value{value}) : fromJson(json);
+    if (!parsed) {
+        std::fprintf(stderr, "zorvanectl: %s cannot be a value: null has no form there\n", printable(value).c_str());
+        return exitUsage;
+    }
+    return withContainer(connect, output, target, what, [&](Client& client, const Client::Address& address) {
+        return done(client.setInfoValue(address, key, parsed), output, what, target, "set");
+    });
+}
+
+int infoUnset(const zorvane::ConnectOptions& connect, const Output& output, const Target& target,
+              const std::string& key) {
+    const std::string what = "unset " + key + " of " + named(target);
+    return withContainer(connect, output, target, what, [&](Client& client, const Client::Address& address) {
+        return done(client.setInfoValue(address, key, std::nullopt), output, what, target, "unset");
+    });
+}
+
+} // namespace zorvanectl
