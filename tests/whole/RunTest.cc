@@ -299,6 +299,10 @@ TEST(Run, ExitCodesAndSignals) {
         const auto outcome = launcher.run(notes, row.words);
         EXPECT_EQ(outcome.exitStatus, row.exitCode) << row.words.back() << ": " << outcome.output;
     }
+    Words careless = {"/usr/bin/env", "--ignore-signal=CHLD"};
+    const Words exits = launcher.words(notes, {"--", "sh", "-c", "exit 9"});
+    careless.insert(careless.end(), exits.begin(), exits.end());
+    EXPECT_EQ(runProgram(careless).exitStatus, 9) << "from a caller that does not wait for its children";
     const std::string ready = launcher.data(notes) + "/ready";
     const std::string output = launcher.daemon.path("output");
     const std::string wait = "touch $HOME/ready; while :; do sleep 0.02; done";
@@ -322,6 +326,16 @@ TEST(Run, ExitCodesAndSignals) {
         ::kill(run.pid(), signal.number);
         EXPECT_EQ(run.end(), signal.exitCode) << signal.number;
         EXPECT_EQ(contentOf(output), signal.says);
+    }
+    // A signal that comes before there is a program ends the program at its beginning.
+    files::remove(ready);
+    const std::string maker = launcher.daemon.path("maker");
+    writeFile(maker, "#!/bin/sh\ntouch " + ready + "\nsleep 0.3\nexec /usr/bin/bwrap \"$@\"\n", 0755);
+    {
+        Background run(launcher.words(notes, {"--bubblewrap", maker, "--", "sleep", "60"}), output);
+        ASSERT_TRUE(waitUntil([&] { return files::exists(ready); }));
+        ::kill(run.pid(), SIGTERM);
+        EXPECT_EQ(run.end(), 128 + SIGTERM);
     }
     // A lock that only the program holds is free again when the launcher was killed.
     files::remove(ready);

@@ -150,6 +150,8 @@ Result<int> runSandboxed(const Options& options, const std::vector<Mount>& mount
         return std::unexpected(failure("cannot make a socket", errno));
     FileDescriptor channel(ends[0]);
     FileDescriptor inner(ends[1]);
+    // A caller that ignores the end of its children would leave nothing to wait for, here and in the sandbox's maker.
+    ::signal(SIGCHLD, SIG_DFL);
     sigset_t caught = signalSet();
     ::sigaddset(&caught, SIGCHLD);
     FileDescriptor signals(::signalfd(-1, &caught, SFD_CLOEXEC | SFD_NONBLOCK));
