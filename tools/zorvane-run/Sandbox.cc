@@ -2,6 +2,7 @@
 #include "Sandbox.h"
 
 #include "Inside.h"
+#include "Staging.h"
 
 #include <algorithm>
 #include <set>
@@ -52,11 +53,11 @@ std::vector<std::string> sandboxArguments(const Options& options, const std::vec
     for (const char* place : {"/dev/shm", "/tmp"})
         append(arguments, {"--perms", "1777", "--size", temporaryBytesMax, "--tmpfs", place});
     std::set<std::string> made = {"/proc", "/dev", "/dev/shm", "/tmp"};
-    for (const Mount& mount : mounts) {
+    for (std::size_t i = 0; i < mounts.size(); ++i) {
+        const Mount& mount = mounts[i];
         makeParents(arguments, mount.path, made);
         if (mount.linkTarget.empty())
-            append(arguments, {mount.isContainer() ? "--bind-fd" : "--ro-bind-fd",
-                               std::to_string(mount.descriptor.get()), mount.path});
+            append(arguments, {mount.isContainer() ? "--bind" : "--ro-bind", stagedPath(i), mount.path});
         else
             append(arguments, {"--symlink", mount.linkTarget, mount.path});
     }

@@ -3,6 +3,7 @@
 
 #include "Descriptors.h"
 #include "Sandbox.h"
+#include "Staging.h"
 
 #include <cerrno>
 #include <csignal>
@@ -125,17 +126,21 @@ private:
 /// In the child: becomes the maker of the sandbox. Never returns.
 [[noreturn]] void executeMaker(const std::vector<Mount>& mounts, InsideHandles handles, pid_t parent,
                                std::vector<char*>& arguments, std::vector<char*>& environment) {
-    bool kept = keepOnExec(handles.program) && keepOnExec(handles.channel);
-    for (const Mount& mount : mounts)
-        kept = kept && (!mount.descriptor.valid() || keepOnExec(mount.descriptor.get()));
+    const char* failed = "prctl";
     // Until the maker asks for the same itself.
-    kept = kept && ::prctl(PR_SET_PDEATHSIG, SIGKILL) == 0 && ::getppid() == parent;
+    if (::prctl(PR_SET_PDEATHSIG, SIGKILL) == 0 && ::getppid() == parent)
+        failed = stage(mounts);
+    if (!failed && !(keepOnExec(handles.program) && keepOnExec(handles.channel)))
+        failed = "fcntl";
     // The signals stay blocked; only that of children is the maker's own to wait for.
     const sigset_t blocked = signalSet();
-    if (kept && ::sigprocmask(SIG_SETMASK, &blocked, nullptr) == 0)
+    if (!failed && ::sigprocmask(SIG_SETMASK, &blocked, nullptr) != 0)
+        failed = "sigprocmask";
+    if (!failed) {
         ::execve(arguments[0], arguments.data(), environment.data());
-    std::fprintf(stderr, "zorvane-run: %s\n",
-                 printable(withReason("cannot execute " + std::string(arguments[0]), errno)).c_str());
+        failed = arguments[0];
+    }
+    std::fprintf(stderr, "zorvane-run: %s\n", printable(withReason(failed, errno)).c_str());
     ::_exit(exitFailure);
 }
 
@@ -171,10 +176,9 @@ Result<int> runSandboxed(const Options& options, const std::vector<Mount>& mount
     inner.reset(); // or the channel would never end
     if (const auto exitCode = Supervisor(maker, std::move(channel), std::move(signals)).wait())
         return *exitCode;
-    return std::unexpected(
-        Failure{.what = "the sandbox could not be made; " + options.bubblewrap + " or zorvane-run said why above",
-                .advice = "install bubblewrap (0.8.0-2+deb12u1 or newer), and allow mount, process and IPC namespaces "
-                          "where this runs"});
+    return std::unexpected(Failure{
+        .what = "the sandbox could not be made; " + options.bubblewrap + " or zorvane-run said why above",
+        .advice = "install bubblewrap 0.8 or newer, and allow mount, process and IPC namespaces where this runs"});
 }
 
 } // namespace zorvanerun

@@ -1,0 +1,20 @@
+// SPDX-License-Identifier: Apache-2.0
+// Gives the sandbox's maker, which takes paths, what this program holds as descriptors.
+//
+// What was opened and checked is mounted, by its descriptor, in a directory that exists in a mount namespace of the
+// caller alone. Nobody else sees that directory or can change what its names lead to, and no path of a container is
+// ever resolved again. All of it goes with the last process of the namespace.
+#pragma once
+
+#include "Mounts.h"
+
+namespace zorvanerun {
+
+/// Where the mount with this index is, after stage().
+[[nodiscard]] std::string stagedPath(std::size_t index);
+
+/// Moves this process into a mount namespace of its own, with everything that has a descriptor in its place there.
+/// nullptr, or the name of the call that failed (errno says why).
+[[nodiscard]] const char* stage(const std::vector<Mount>& mounts);
+
+} // namespace zorvanerun
