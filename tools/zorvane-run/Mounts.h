@@ -2,7 +2,7 @@
 // What the sandbox shows of the file system, each thing as an open descriptor.
 //
 // A container is opened from the root without following a link, and has to be a directory of its owner. From then on
-// the descriptor is what is handed over: whatever is put in its place afterwards is not mounted.
+// the descriptor is what counts (Staging.h): whatever is put in its place afterwards is not mounted.
 #pragma once
 
 #include "Failure.h"
