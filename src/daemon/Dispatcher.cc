@@ -120,9 +120,9 @@ Dispatcher::checkEntitlementsAndInitClientObject(const ZORCommandTableRow& row, 
 }
 
 void Dispatcher::registerEntitlements(const std::string* identifier, const plist::Dictionary& entitlements) const {
-    if (identifier && !services_.entitlements.callerRegistrationIsDue(*identifier, entitlements))
-        return;
     static const plist::Dictionary byCaller{{std::string(entitlementMapKeys::registeredByCaller), true}};
+    if (identifier && !services_.entitlements.callerRegistrationIsDue(*identifier, entitlements, byCaller))
+        return;
     const ErrorCode code = services_.entitlements.processEntitlements(&entitlements, identifier, &byCaller);
     if (code != ErrorCode::success)
         log_.write(logLevelError, handlerName, "Error processing entitlements for %s : %llu", ZOR_SHOWN(identifier),

@@ -70,9 +70,10 @@ public:
     ErrorCode processEntitlements(const plist::Dictionary* entitlements, const std::string* identifier,
                                   const plist::Dictionary* options) ZOR_EXCLUDES(entitlementQueue_);
     /// Whether a peer with this identifier has to be registered as it comes: it has never been, or it was registered so
-    /// with something else. One short visit to the queue: asked for every message.
-    [[nodiscard]] bool callerRegistrationIsDue(const std::string& identifier, const plist::Dictionary& entitlements)
-        ZOR_EXCLUDES(entitlementQueue_);
+    /// and processing it with these arguments would change something. One short visit to the queue: asked for every
+    /// message.
+    [[nodiscard]] bool callerRegistrationIsDue(const std::string& identifier, const plist::Dictionary& entitlements,
+                                               const plist::Dictionary& options) ZOR_EXCLUDES(entitlementQueue_);
     /// Removes what is stored for an identifier and for the children recorded for it. The caller holds the
     /// all-identifiers lock, or knows why it need not.
     void removeEntitlementDictionariesForIdentifierAndItsChildren(const std::string& identifier)

@@ -28,6 +28,15 @@ bool isReserved(std::string_view key) {
            key == entitlementMapKeys::placeholder;
 }
 
+const plist::Value* parentIn(const plist::Dictionary* options) {
+    return options ? options->find(ipc::keys::parentBundleIdOption) : nullptr;
+}
+
+bool canBeProcessed(const std::string& identifier, const plist::Dictionary* options) {
+    const plist::Value* parent = parentIn(options);
+    return !isReserved(identifier) && (!parent || parent->asString());
+}
+
 /// What is stored under the map's own keys is the daemon's; anything else there counts as nothing.
 plist::Dictionary copyOf(const plist::Dictionary* dictionary) {
     return dictionary ? *dictionary : plist::Dictionary();
@@ -160,14 +169,12 @@ ErrorCode ZOREntitlementMapping::_onQueue_processEntitlements(const plist::Dicti
                                                               const plist::Dictionary* options) {
     if (!identifier)
         return ErrorCode::identifierMissing;
-    const plist::Value* parent = options ? options->find(ipc::keys::parentBundleIdOption) : nullptr;
-    if (isReserved(*identifier) || (parent && !parent->asString())) {
-        makeError(log_, {processFunction, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                  "Can't act on an invalid object: ID: %s, parent ID: %s", ZOR_SHOWN(*identifier),
-                  plist::describe(parent).c_str());
-        return ErrorCode::invalidObject;
-    }
     try {
+        if (!canBeProcessed(*identifier, options))
+            return makeError(log_, {processFunction, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
+                             "Can't act on an invalid object: ID: %s, parent ID: %s", ZOR_SHOWN(*identifier),
+                             plist::describe(parentIn(options)).c_str())
+                .replyCode();
         const auto processed = _onQueue_process(entitlements, *identifier, options);
         return processed ? ErrorCode::success : processed.error().replyCode();
     } catch (const std::exception& exception) {
@@ -177,24 +184,26 @@ ErrorCode ZOREntitlementMapping::_onQueue_processEntitlements(const plist::Dicti
 
 ErrorCode ZOREntitlementMapping::processEntitlements(const plist::Dictionary* entitlements,
                                                      const std::string* identifier, const plist::Dictionary* options) {
-    if (identifier) {
+    const auto processed = services_.boundary.run({"processEntitlements", __LINE__}, [&]() -> Result<ErrorCode> {
+        if (identifier && canBeProcessed(*identifier, options)) {
+            const MutexLock held(entitlementQueue_);
+            if (!unsaved_ && _onQueue_stage(entitlements, *identifier, options, SayStaging::no).empty())
+                return ErrorCode::success;
+        }
+        const AllIdentifiersLock lock(services_.locks, LockMode::writing);
         const MutexLock held(entitlementQueue_);
-        if (!unsaved_ && !isReserved(*identifier) &&
-            _onQueue_stage(entitlements, *identifier, options, SayStaging::no).empty())
-            return ErrorCode::success;
-    }
-    const AllIdentifiersLock lock(services_.locks, LockMode::writing);
-    const MutexLock held(entitlementQueue_);
-    return _onQueue_processEntitlements(entitlements, identifier, options);
+        return _onQueue_processEntitlements(entitlements, identifier, options);
+    });
+    return processed ? *processed : processed.error().replyCode();
 }
 
 bool ZOREntitlementMapping::callerRegistrationIsDue(const std::string& identifier,
-                                                    const plist::Dictionary& entitlements) {
+                                                    const plist::Dictionary& entitlements,
+                                                    const plist::Dictionary& options) {
     const MutexLock held(entitlementQueue_);
     if (!_onQueue_identifierHasCallerRegisteredEntitlements(identifier))
         return entitlementMappingDict_.find(identifier) == nullptr;
-    const plist::Dictionary* stored = entitlementsOf(identifier);
-    return unsaved_ || !stored || *stored != entitlements;
+    return unsaved_ || !_onQueue_stage(&entitlements, identifier, &options, SayStaging::no).empty();
 }
 
 void ZOREntitlementMapping::removeEntitlementDictionariesForIdentifierAndItsChildren(const std::string& identifier) {
