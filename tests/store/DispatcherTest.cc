@@ -2,13 +2,9 @@
 // The way of a message: who is admitted to which command, what is said and done to those who are not, who sends the
 // reply, and the commands for containers from a request's keys to a reply's.
 #include "daemon/commands/Commands.h"
-#include "platform/EntitlementKeys.h"
-#include "world/World.h"
+#include "store/DispatchFixture.h"
 
-#include <chrono>
-#include <gtest/gtest.h>
 #include <set>
-#include <thread>
 
 namespace zor::test {
 namespace {
@@ -17,97 +13,7 @@ using plist::Array;
 using plist::Dictionary;
 using support::LogLine;
 
-namespace powers = platform::entitlementKeys;
 using Kind = platform::ServiceEvent::Kind;
-
-constexpr pid_t peerPid = 4711;
-constexpr const char* handler = "ZORProcessIpsiEvent";
-constexpr const char* admission = "checkEntitlementsAndInitClientObject";
-
-class FakePeer final : public platform::Peer {
-public:
-    [[nodiscard]] platform::Identity identify(Explain) override { return identity; }
-    [[nodiscard]] pid_t pid() const override { return identity.pid; }
-    [[nodiscard]] uid_t kernelUserId() const override { return identity.effectiveUserId; }
-    platform::Identity identity;
-};
-
-class FakeConnection final : public platform::PeerConnection {
-public:
-    platform::Peer& peer() override { return peer_; }
-    void cancel() override { ++cancelled; }
-    FakePeer peer_;
-    int cancelled = 0;
-};
-
-class FakeReply final : public platform::ReplyChannel {
-public:
-    void send(const Dictionary& reply) override {
-        const platform::MutexLock held(mutex_);
-        replies_.push_back(reply);
-    }
-    [[nodiscard]] std::vector<Dictionary> replies() const {
-        const platform::MutexLock held(mutex_);
-        return replies_;
-    }
-
-private:
-    mutable platform::Mutex mutex_;
-    std::vector<Dictionary> replies_ ZOR_GUARDED_BY(mutex_);
-};
-
-std::shared_ptr<const platform::IdentityGrant> grant(std::optional<std::string> identifier,
-                                                     std::optional<Dictionary> entitlements) {
-    return std::make_shared<platform::IdentityGrant>(
-        platform::IdentityGrant{.identifier = std::move(identifier), .entitlements = std::move(entitlements)});
-}
-
-const Dictionary noPowers{};
-const Dictionary everything{{std::string(powers::allowed), true}};
-
-class Dispatch : public testing::Test {
-protected:
-    Dispatch() {
-        world.load();
-        as(grant("com.example", noPowers));
-        world.log.take();
-    }
-    void as(std::shared_ptr<const platform::IdentityGrant> granted, std::uint32_t userId = mobile) {
-        connection.peer_.identity = {.pid = peerPid, .effectiveUserId = userId, .grant = std::move(granted)};
-    }
-    void handle(platform::ServiceEvent event) { world.services().dispatcher().ZORProcessIpsiEvent(connection, event); }
-    /// The one reply; the connection must have stayed open.
-    Dictionary request(const Dictionary& message) {
-        const auto channel = std::make_shared<FakeReply>();
-        handle({.kind = Kind::message, .request = message, .reply = channel});
-        for (int i = 0; i < 5000 && channel->replies().empty() && connection.cancelled == 0; ++i)
-            std::this_thread::sleep_for(std::chrono::milliseconds(1));
-        world.drainDeathRow();
-        EXPECT_EQ(connection.cancelled, 0);
-        EXPECT_EQ(channel->replies().size(), 1U);
-        return channel->replies().empty() ? Dictionary() : channel->replies()[0];
-    }
-    /// Expects the refusal of a message: the connection ends, nothing is answered.
-    void expectRefused(const Dictionary& message, const std::vector<LogLine>& lines) {
-        const auto channel = std::make_shared<FakeReply>();
-        connection.cancelled = 0;
-        world.log.take();
-        handle({.kind = Kind::message, .request = message, .reply = channel});
-        EXPECT_EQ(connection.cancelled, 1);
-        EXPECT_TRUE(channel->replies().empty());
-        EXPECT_EQ(world.log.take(), lines);
-        connection.cancelled = 0;
-    }
-    static std::uint64_t errorOf(const Dictionary& reply) { return reply.unsignedInteger("ReplyError").value_or(0); }
-    static LogLine missing(const std::string& identifier, std::string_view entitlement) {
-        return {3, admission,
-                "connection attempt from pid 4711 (" + identifier +
-                    ") missing required entitlement: " + std::string(entitlement)};
-    }
-
-    World world;
-    FakeConnection connection;
-};
 
 // Goal: each way of being refused has its lines and ends the connection without a reply. Method: a table.
 TEST_F(Dispatch, Refusals) {
@@ -194,8 +100,7 @@ TEST_F(Dispatch, EveryCommandAdmitsByItsEntitlement) {
             if (admitted) {
                 const Dictionary reply = request(message);
                 EXPECT_NE(errorOf(reply), 0U);
-                const ZORCommandHandler run = commandTable[command].handler;
-                if (run == commands::notServedYet || run == commands::notServedYetDeferred) {
+                if (commandTable[command].handler == commands::notServedYet) {
                     EXPECT_NE(errorOf(reply), ipc::replySuccess);
                 }
             } else {

@@ -1,0 +1,321 @@
+// SPDX-License-Identifier: Apache-2.0
+// Deletion, entitlements and shared containers from a request's keys to a reply's, and the registration of a peer by
+// its own messages.
+#include "entitlements/ZOREntitlementMapping.h"
+#include "store/DispatchFixture.h"
+
+#include <atomic>
+#include <set>
+#include <unistd.h>
+
+namespace zor::test {
+namespace {
+
+using plist::Array;
+using plist::Dictionary;
+using support::DiskCall;
+using support::DiskCallInfo;
+using support::hasLine;
+
+const char* const apps = "com.veltra.security.application-groups";
+const char* const groups = "com.veltra.security.system-groups";
+const char* const systemContainer = "com.veltra.security.system-container";
+const char* const byCaller = "com.veltra.Zorvane.EntitlementsRegisteredByCaller";
+
+class Shared : public Dispatch {
+protected:
+    Shared() { asInstaller(); }
+    void asInstaller() { as(grant("installer", everything), 0); }
+    void asClient(const std::optional<std::string>& identifier, Dictionary entitlements = {}) {
+        as(grant(identifier, std::move(entitlements)));
+    }
+    std::uint64_t codeOf(const Dictionary& message) { return errorOf(request(message)); }
+    plist::Data make(const char* identifier, std::uint64_t containerClass = 2) {
+        const Dictionary reply = request({{"ContainerClass", containerClass},
+                                          {"UserID", containerClass == 1 ? 33 : 501},
+                                          {"Identifier", identifier},
+                                          {"CreateIfNecessary", true}});
+        return reply.data("ReplyUUID") ? *reply.data("ReplyUUID") : plist::Data();
+    }
+    bool isThere(const char* identifier, std::uint64_t containerClass = 2) {
+        return codeOf({{"ContainerClass", containerClass},
+                       {"UserID", containerClass == 1 ? 33 : 501},
+                       {"Identifier", identifier}}) == 1;
+    }
+    ZOREntitlementMapping& mapping() { return world.services().entitlements(); }
+    std::set<std::string> groupsIn(const Dictionary& reply) {
+        std::set<std::string> found;
+        if (const Dictionary* paths = reply.dictionary("ReplyGroupContainerDict"))
+            for (const auto& [group, path] : *paths) {
+                EXPECT_TRUE(path.asString() && ::access(path.asString()->c_str(), F_OK) == 0) << group;
+                found.insert(group);
+            }
+        return found;
+    }
+};
+
+// Goal: command 3 stages all of what it can read, or refuses lists that cannot be read before anything is staged.
+// Method: lists of two containers, broken in one place each.
+TEST_F(Shared, StagesLists) {
+    const plist::Data a = make("a");
+    const plist::Data b = make("b", 1);
+    const auto message = [&](const char* key, plist::Value value) {
+        Dictionary lists{{"Command", 3},
+                         {"ContainerClassesArray", Array{2, 1}},
+                         {"UUIDsArray", Array{a, b}},
+                         {"UserIDsArray", Array{1, 33}},
+                         {"IdentifiersArray", Array{"a", "b"}}};
+        lists.set(key, std::move(value));
+        return lists;
+    };
+    struct Row {
+        const char* key;
+        plist::Value value;
+        std::uint64_t code;
+    };
+    const Row rows[] = {
+        {"UserIDsArray", Array{1, 34}, 38},
+        {"UserIDsArray", Array{1, "33"}, 38},
+        {"UserIDsArray", Array{34, 33}, 38},
+        {"UserIDsArray", Array{1, 33, 1}, 11},
+        {"ContainerClassesArray", Array{2}, 11},
+        {"ContainerClassesArray", 2, 11},
+        {"ContainerClassesArray", Array{2, "1"}, 11},
+        {"ContainerClassesArray", Array{2, 1, 2}, 11},
+        {"UUIDsArray", Array{a}, 11},
+        {"UUIDsArray", Array{a, "b"}, 11},
+        {"UUIDsArray", Array{a, plist::Data(15)}, 11},
+        {"IdentifiersArray", Array{"a"}, 11},
+        {"IdentifiersArray", "a", 11},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(std::string(row.key) + " " + plist::describe(&row.value));
+        world.log.take();
+        EXPECT_EQ(request(message(row.key, row.value)), (Dictionary{{"ReplyError", row.code}}));
+        EXPECT_EQ(
+            hasLine(world.log.take(), 3, "stageContainerForDelete", "Got non-Array input for the identifiers array"),
+            row.value.asString() != nullptr);
+        EXPECT_TRUE(isThere("a") && isThere("b", 1));
+    }
+    EXPECT_EQ(codeOf({{"Command", 3}}), 1U);
+    EXPECT_EQ(codeOf(message("IdentifiersArray", Array{5, "b"})), 1U); // the first is skipped
+    EXPECT_TRUE(isThere("a") && !isThere("b", 1));
+    EXPECT_EQ(request(message("Command", 3)), (Dictionary{{"ReplyError", std::uint64_t{1}}}));
+    EXPECT_FALSE(isThere("a"));
+}
+
+TEST_F(Shared, DeletesTheContainerOfAnIdentifier) {
+    (void)make("a");
+    (void)make("installer");
+    const Dictionary deletion{{"Command", 10}, {"ContainerClass", 2}, {"UserID", 1}, {"Identifier", "a"}};
+    EXPECT_EQ(request(deletion), (Dictionary{{"ReplyError", std::uint64_t{1}}}));
+    EXPECT_FALSE(isThere("a"));
+    EXPECT_EQ(codeOf(deletion), 21U);
+    EXPECT_EQ(codeOf({{"Command", 10}, {"ContainerClass", 2}, {"UserID", 1}}), 11U); // never its own by default
+    EXPECT_EQ(codeOf({{"Command", 10}, {"ContainerClass", 2}, {"UserID", 499}, {"Identifier", "a"}}), 38U);
+    EXPECT_TRUE(isThere("installer"));
+}
+
+// Goal: a registration by command 18 decides what commands 13, 14 and 16 tell; every path is there and stays the same.
+// Method: an installer registers, clients ask.
+TEST_F(Shared, GroupPaths) {
+    EXPECT_EQ(codeOf({{"Command", 18}, {"Entitlements", Dictionary{{"k", 1}}}}), 18U);
+    for (const char* key : {"Entitlements", "OptionsDictionary"})
+        EXPECT_EQ(codeOf({{"Command", 18}, {"Identifier", "app"}, {key, "text"}}), 11U);
+    EXPECT_FALSE(mapping().entitlementsExistForIdentifier("app"));
+    const Dictionary entitlements{{apps, Array{"g", "h"}}, {groups, Array{"systemgroup.s", "bare"}}};
+    EXPECT_EQ(request({{"Command", 18}, {"Identifier", "app"}, {"Entitlements", entitlements}}),
+              (Dictionary{{"ReplyError", std::uint64_t{1}}}));
+    EXPECT_EQ(request({{"Command", 14}, {"UserID", 1}, {"Identifier", "app"}}),
+              (Dictionary{{"ReplyError", std::uint64_t{1}}, {"ReplyGroupIdentifiersArray", Array{"g", "h"}}}));
+    EXPECT_EQ(request({{"Command", 14}, {"UserID", 1}}),
+              (Dictionary{{"ReplyError", std::uint64_t{1}}, {"ReplyGroupIdentifiersArray", Array{}}}));
+    EXPECT_EQ(request({{"Command", 14}, {"UserID", 33}}), (Dictionary{{"ReplyError", std::uint64_t{38}}}));
+
+    asClient("app");
+    const Dictionary appPaths = request({{"Command", 13}, {"UserID", 1}});
+    EXPECT_EQ(appPaths.size(), 2U);
+    EXPECT_EQ(groupsIn(appPaths), (std::set<std::string>{"g", "h"}));
+    const Dictionary systemPaths = request({{"Command", 16}});
+    EXPECT_EQ(groupsIn(systemPaths), (std::set<std::string>{"systemgroup.s"}));
+    EXPECT_EQ(request({{"Command", 13}, {"UserID", 501}}), appPaths);
+    EXPECT_EQ(codeOf({{"Command", 13}, {"UserID", 502}}), 38U);
+    asClient("other");
+    EXPECT_EQ(request({{"Command", 13}, {"UserID", 1}, {"Identifier", "app"}}), appPaths);
+    EXPECT_EQ(request({{"Command", 16}, {"Identifier", "app"}}), systemPaths);
+    EXPECT_EQ(request({{"Command", 16}}),
+              (Dictionary{{"ReplyError", std::uint64_t{1}}, {"ReplyGroupContainerDict", Dictionary{}}}));
+    asClient({});
+    EXPECT_EQ(request({{"Command", 13}, {"UserID", 1}}), (Dictionary{{"ReplyError", std::uint64_t{11}}}));
+    asInstaller();
+    EXPECT_EQ(codeOf({{"Command", 18}, {"Identifier", "app"}}), 1U);
+    EXPECT_TRUE(groupsIn(request({{"Command", 13}, {"UserID", 1}, {"Identifier", "app"}})).empty());
+    EXPECT_NE(::access(appPaths.dictionary("ReplyGroupContainerDict")->string("g")->c_str(), F_OK), 0);
+}
+
+// Goal: whose system container and which system group a client reaches, and with which code it is refused. Method: a
+// table of clients and requests.
+TEST_F(Shared, SystemContainersAndGroups) {
+    const Dictionary owner{{systemContainer, true}};
+    const Dictionary member{{groups, Array{"systemgroup.s", "bare"}}};
+    const Dictionary powerful{{std::string(powers::otherIdLookup), true}};
+    const auto container = [](const char* identifier) {
+        return identifier ? Dictionary{{"Command", 15}, {"Identifier", identifier}} : Dictionary{{"Command", 15}};
+    };
+    const auto group = [](plist::Value identifier) {
+        return Dictionary{{"Command", 17}, {"GroupIdentifier", std::move(identifier)}};
+    };
+    const auto groupOf = [&](const char* identifier, const char* name) {
+        Dictionary message = group(name);
+        message.set("Identifier", identifier);
+        return message;
+    };
+    struct Row {
+        const char* name;
+        std::optional<std::string> client;
+        Dictionary entitlements;
+        Dictionary message;
+        std::uint64_t code;
+        std::string said;
+    };
+    const std::string noGroup = " is not entitled for system group identifier: ";
+    const Row rows[] = {
+        {"its own", "owner", owner, container(nullptr), 1, ""},
+        {"not entitled to one", "plain", {}, container(nullptr), 55, ""},
+        {"another's, who is entitled", "plain", {}, container("owner"), 1, ""},
+        {"another's, who is not", "plain", {}, container("nobody"), 55, ""},
+        {"a well-known one", "plain", {}, container("com.veltra.settingsd"), 1, ""},
+        {"the next request", "plain", {}, container("nobody"), 55, ""},
+        {"its own of that name", "com.veltra.settingsd", {}, container(nullptr), 55, ""},
+        {"any, with the power", "lookup", powerful, container("nobody"), 1, ""},
+        {"nobody's", std::nullopt, {}, container(nullptr), 11, ""},
+        {"its group", "member", member, group("systemgroup.s"), 1, ""},
+        {"a group without its prefix", "member", member, group("bare"), 55, "member" + noGroup + "bare"},
+        {"a well-known group", "plain", {}, group("systemgroup.com.veltra.fonts"), 1, ""},
+        {"an unknown group", "plain", {}, group("systemgroup.s"), 55, "plain" + noGroup + "systemgroup.s"},
+        {"another's group", "plain", {}, groupOf("member", "systemgroup.s"), 55, "plain" + noGroup + "systemgroup.s"},
+        {"its group, as another", "member", member, groupOf("plain", "systemgroup.s"), 21,
+         "Did not find system group container with identifier: systemgroup.s for plain"},
+        {"no group", "member", member, group(5), 55, "member" + noGroup + "(null)"},
+        {"no client", std::nullopt, {}, group("systemgroup.s"), 55, "(null)" + noGroup + "systemgroup.s"},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.name);
+        asClient(row.client, row.entitlements);
+        world.log.take();
+        const Dictionary reply = request(row.message);
+        EXPECT_EQ(errorOf(reply), row.code);
+        const std::string* path = reply.string("ReplyPath");
+        EXPECT_EQ(path != nullptr, row.code == 1);
+        EXPECT_EQ(reply.size(), row.code == 1 ? 2U : 1U);
+        if (path) {
+            EXPECT_EQ(::access(path->c_str(), F_OK), 0);
+            EXPECT_EQ(request(row.message), reply);
+        }
+        EXPECT_EQ(hasLine(world.log.take(), 3, "systemGroupContainerPath", row.said), !row.said.empty());
+    }
+    // What cannot be made is not found, whatever the reason.
+    asClient("plain");
+    for (const char* name : {"systemgroup.com.veltra.timezone", "systemgroup.n"}) {
+        if (name == std::string("systemgroup.n"))
+            asClient("newcomer", {{groups, Array{name}}});
+        (void)request({{"Command", 13}, {"UserID", 1}}); // registers
+        world.disk().arm(
+            {.error = EIO, .filter = [](const DiskCallInfo& call) { return call.call == DiskCall::rename; }});
+        EXPECT_EQ(codeOf(group(name)), 21U);
+        world.disk().disarm();
+    }
+}
+
+// Goal: a peer is registered by its first message and again when its entry changes; never over what an installer
+// registered; children and flags that its registration does not carry are forgotten; nobody is refused for it. Method:
+// messages in a row, the map after each.
+TEST_F(Shared, PeersRegisterThemselves) {
+    const Dictionary first{{apps, Array{"g"}}};
+    const Dictionary changed{{apps, Array{"h"}}};
+    const Dictionary flag{{"app", true}};
+    const Dictionary ask{{"Command", 13}, {"UserID", 1}};
+    const auto registered = [&] { return mapping().entitlementMappingDict(); };
+    asClient("app", first);
+    EXPECT_EQ(groupsIn(request(ask)), (std::set<std::string>{"g"})); // served with what it brought
+    EXPECT_EQ(registered(), (Dictionary{{"app", first}, {byCaller, flag}}));
+    world.disk().arm({.filter = [](const DiskCallInfo& call) {
+        ADD_FAILURE() << call.describe();
+        return false;
+    }});
+    EXPECT_EQ(groupsIn(request(ask)), (std::set<std::string>{"g"}));
+    world.disk().disarm();
+    asClient("app", changed);
+    EXPECT_EQ(groupsIn(request(ask)), (std::set<std::string>{"h"}));
+    EXPECT_EQ(registered(), (Dictionary{{"app", changed}, {byCaller, flag}}));
+    const Dictionary child{{"k", 1}};
+    (void)mapping().processEntitlements(
+        &child, std::make_unique<std::string>("child").get(),
+        std::make_unique<Dictionary>(Dictionary{{"com.veltra.Zorvane.ParentBundleID", "app"}}).get());
+    EXPECT_EQ(registered().size(), 4U);
+    (void)request(ask);
+    EXPECT_EQ(registered(), (Dictionary{{"app", changed}, {"child", child}, {byCaller, flag}}));
+
+    asInstaller();
+    EXPECT_EQ(codeOf({{"Command", 18}, {"Identifier", "app"}, {"Entitlements", first}}), 1U);
+    asClient("app", changed);
+    EXPECT_EQ(groupsIn(request(ask)), (std::set<std::string>{"g"}));
+    EXPECT_EQ(*registered().dictionary("app"), first);
+
+    // Without entitlements to store only the flag is.
+    asClient("bare");
+    (void)request(ask);
+    EXPECT_TRUE(registered().dictionary(byCaller)->isTrue("bare"));
+    EXPECT_EQ(registered().find("bare"), nullptr);
+    asClient({});
+    world.log.take();
+    EXPECT_EQ(codeOf(ask), 11U);
+    EXPECT_TRUE(hasLine(world.log.take(), 3, handler, "Error processing entitlements for (null) : 18"));
+    // A registration that cannot be saved is said, and made up for.
+    asClient("late", first);
+    world.disk().arm({.error = ENOSPC, .filter = [](const DiskCallInfo& call) {
+                          return call.subject.ends_with("-> zor_entitlements.plist");
+                      }});
+    EXPECT_EQ(codeOf(ask), 1U);
+    world.disk().disarm();
+    EXPECT_TRUE(hasLine(world.log.take(), 3, handler, "Error processing entitlements for late : 59"));
+    EXPECT_EQ(codeOf(ask), 1U);
+    world.restart();
+    EXPECT_TRUE(mapping().identifierHasCallerRegisteredEntitlements("late"));
+}
+
+// Goal: one identity with many connections at once is registered once, and each is served. Method: threads with a
+// connection each.
+TEST_F(Shared, OneIdentityOnManyConnections) {
+    std::atomic<std::size_t> writes{0};
+    world.disk().arm({.filter = [&](const DiskCallInfo& call) {
+        writes += call.subject.ends_with("-> zor_entitlements.plist");
+        return false;
+    }});
+    constexpr int threadCount = 4;
+    constexpr int messages = 20;
+    std::atomic<int> served{0};
+    std::vector<std::thread> threads;
+    for (int t = 0; t < threadCount; ++t)
+        threads.emplace_back([&] {
+            FakeConnection own;
+            own.peer_.identity = {
+                .pid = peerPid, .effectiveUserId = mobile, .grant = grant("app", Dictionary{{apps, Array{"g"}}})};
+            for (int i = 0; i < messages; ++i) {
+                const auto channel = std::make_shared<FakeReply>();
+                platform::ServiceEvent event{.kind = platform::ServiceEvent::Kind::message,
+                                             .request = {{"Command", 13}, {"UserID", 1}},
+                                             .reply = channel};
+                world.services().dispatcher().ZORProcessIpsiEvent(own, event);
+                served += channel->replies().size() == 1 && groupsIn(channel->replies()[0]).contains("g");
+            }
+        });
+    for (std::thread& thread : threads)
+        thread.join();
+    world.disk().disarm();
+    EXPECT_EQ(served, threadCount * messages);
+    EXPECT_EQ(writes, 1U);
+}
+
+} // namespace
+} // namespace zor::test
