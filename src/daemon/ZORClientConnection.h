@@ -30,6 +30,7 @@
 
 namespace zor {
 
+struct ReplaceJournal;
 struct StoreServices;
 
 enum class UseLocking : std::int32_t { no, yes };
@@ -216,9 +217,12 @@ private:
     Result<void> moveOldAway(const ReplaceRequest& request, ReplaceProgress& progress);
     Result<void> putNewInPlace(const ReplaceRequest& request, ReplaceProgress& progress);
     Result<void> refuseSecondOfIdentifier(const ReplaceProgress& progress);
+    /// What was changed in one directory is on the disk before what comes in the other can be. 0 or a negative errno.
+    int orderBetween(const FileURL& changed, const FileURL& next);
     void recoverFromException(const ReplaceProgress& progress);
     std::optional<ZORError> cleanUpReplace(const ReplaceProgress& progress, StartDeletionThread startDeletionThread);
     Result<void> recoverReplace(const FileURL& journalUrl);
+    Result<void> moveBack(const ReplaceJournal& journal, const FileURL& journalUrl);
 
     Result<std::shared_ptr<ZORMetadata>> knownContainer(const char* function, const ContainerAddress& address);
     Result<void> checkAddress(const char* function, const ContainerAddress& address);

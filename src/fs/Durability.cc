@@ -78,6 +78,15 @@ int Durability::beforeRemoval(int directory) const {
     return ordering(directory) == Ordering::journal ? 0 : disk_.syncFileSystem(directory);
 }
 
+int Durability::between(int changed, int next) const {
+    struct stat changedStatus{};
+    struct stat nextStatus{};
+    const bool sameFileSystem = ::fstat(changed, &changedStatus) == 0 && ::fstat(next, &nextStatus) == 0 &&
+                                changedStatus.st_dev == nextStatus.st_dev;
+    // A journal keeps the order of its own file system alone.
+    return sameFileSystem && ordering(changed) == Ordering::journal ? 0 : afterMove(changed);
+}
+
 int Durability::afterMove(int directory) const {
     return ordering(directory) == Ordering::journal ? disk_.sync(directory) : disk_.syncFileSystem(directory);
 }

@@ -39,6 +39,9 @@ public:
     /// After things were moved to a directory to be removed there, before they are: else a cut could leave the removal
     /// and undo the move. 0 or a negative errno.
     [[nodiscard]] int beforeRemoval(int directory) const;
+    /// Between a change of names in one directory and one in another that must not be durable without it. 0 or a
+    /// negative errno.
+    [[nodiscard]] int between(int changed, int next) const;
     /// After the move, before it is acknowledged; needs no lock. `directory` is where the name came to be.
     [[nodiscard]] int afterMove(int directory) const;
 

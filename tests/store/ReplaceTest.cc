@@ -279,6 +279,25 @@ TEST_F(Replace, EveryStateOfTheTableIsRecovered) {
     }
 }
 
+// Goal: a root that was moved as a whole between the stop and the launch keeps what its journals speak of. Method: a
+// journal with the paths of another place.
+TEST_F(Replace, AJournalOfAMovedRootIsRecovered) {
+    const std::string journal = "11111111-1111-4111-8111-111111111111";
+    const std::string waiting = staging + "/" + journal;
+    const std::string old = applications + "/22222222-2222-4222-8222-222222222222";
+    world.makeDirectories(applications, mobile);
+    world.write(waiting + "/content", "old");
+    const std::string before = "/elsewhere/";
+    world.write(journals + "/" + journal + ".plist",
+                binary(plist::Dictionary{{"ZORReplaceOperationOldURL", before + old},
+                                         {"ZORReplaceOperationNewURL", before + old + "x"},
+                                         {"ZORReplaceOperationStagingURL", before + waiting},
+                                         {"ZORReplaceOperationDestURL", before + old}}));
+    world.daemonsClient().containerManagerSetup();
+    EXPECT_EQ(world.read(old + "/content"), "old");
+    EXPECT_TRUE(nothingIsUnderWay());
+}
+
 // Goal: a recovery that cannot finish loses nothing: what its journal names stays in staging until a later launch
 // succeeds. Method: a move that fails once.
 TEST_F(Replace, ARecoveryThatStopsKeepsWhatItStillNeeds) {

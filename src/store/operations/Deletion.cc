@@ -110,15 +110,18 @@ bool ZORClientConnection::takeAwayForDelete(const FileURL& container, std::vecto
     const FileURL deathRow = services_.configuration.deathrowDirectory();
     const FileURL destination = deathRow.appendingDirectory(container.lastPathComponent());
     const auto moved = services_.fileManager.moveItemAtURL(container, destination);
-    if (moved) {
+    // A move to another file system is a copy, and does not fail when only the source cannot go: it would be found
+    // again.
+    if (moved && !services_.fileManager.itemExistsAtURL(container)) {
         changed.push_back(deathRow);
         return true;
     }
-    ZOR_LOG(services_.log, logLevelDebug, "Couldn't stage for deletion from %s to %s: %s", container.c_str(),
-            destination.c_str(), moved.error().text().c_str());
+    if (!moved)
+        ZOR_LOG(services_.log, logLevelDebug, "Couldn't stage for deletion from %s to %s: %s", container.c_str(),
+                destination.c_str(), moved.error().text().c_str());
     // An earlier container of a well-known name may still wait on death row under that name. This one goes beside it: a
     // stop while it is removed in place would leave half of it under the name it has.
-    const bool nameIsTaken = moved.error().isPosix(ENOTEMPTY) || moved.error().isPosix(EEXIST);
+    const bool nameIsTaken = !moved && (moved.error().isPosix(ENOTEMPTY) || moved.error().isPosix(EEXIST));
     if (nameIsTaken && _moveItemAtURLToDeathRow(container, StartDeletionThread::no)) {
         changed.push_back(deathRow);
         return true;

@@ -207,6 +207,9 @@ Result<void> ZORClientConnection::moveOldAway(const ReplaceRequest& request, Rep
     }
     if (const auto moved = services_.fileManager.moveItemAtURL(progress.oldUrl, progress.stagingUrl); !moved)
         return oldNotMoved(moved.error());
+    // A move to another file system is a copy, and does not fail when only the source cannot go: two would be live.
+    if (!services_.fileManager.itemDoesNotExistAtURL(progress.oldUrl))
+        return oldNotMoved(posixError(here, EBUSY, "%s is still there", progress.oldUrl.c_str()));
     const bool transient = progress.oldWasTransient;
     const auto removed = services_.cache.removeContainerForUser(request.userIdOld, request.classOld,
                                                                 &progress.oldRecord->identifier(), transient);
@@ -215,8 +218,8 @@ Result<void> ZORClientConnection::moveOldAway(const ReplaceRequest& request, Rep
                          "Failed to remove from cache id: %s, class: %ld, transient: %d",
                          ZOR_SHOWN(progress.oldRecord->identifier()), static_cast<long>(request.classOld), transient);
     // Where nothing else keeps the order of two moves, a cut could leave the second one without the first.
-    const auto staging = services_.fileManager.resolver().openDirectory(services_.configuration.stagingDirectory());
-    const int ordered = staging ? services_.durability.beforeRemoval(staging->get()) : -staging.error();
+    const int ordered =
+        orderBetween(services_.configuration.stagingDirectory(), progress.destUrl.deletingLastPathComponent());
     if (ordered < 0)
         return oldNotMoved(
             posixError(here, -ordered, "sync of %s failed: %s", progress.stagingUrl.c_str(), errorText(-ordered)));
@@ -260,6 +263,14 @@ Result<void> ZORClientConnection::putNewInPlace(const ReplaceRequest& request, R
     return {};
 }
 
+int ZORClientConnection::orderBetween(const FileURL& changed, const FileURL& next) {
+    const auto first = services_.fileManager.resolver().openDirectory(changed);
+    const auto second = services_.fileManager.resolver().openDirectory(next);
+    if (!first || !second)
+        return -(first ? second.error() : first.error());
+    return services_.durability.between(first->get(), second->get());
+}
+
 void ZORClientConnection::recoverFromException(const ReplaceProgress& progress) {
     ZORFileManager& fileManager = services_.fileManager;
     if (progress.oldUrl.empty() || progress.destUrl.empty() || !fileManager.itemDoesNotExistAtURL(progress.oldUrl) ||
@@ -290,9 +301,7 @@ std::optional<ZORError> ZORClientConnection::cleanUpReplace(const ReplaceProgres
         return failed;
     // The moves are on the disk before the journal can be gone.
     const FileURL place = progress.destUrl.deletingLastPathComponent();
-    const auto directory = services_.fileManager.resolver().openDirectory(place);
-    const int ordered = directory ? services_.durability.beforeRemoval(directory->get()) : -directory.error();
-    if (ordered < 0)
+    if (const int ordered = orderBetween(place, services_.configuration.replaceDirectory()); ordered < 0)
         services_.log.write(logLevelError, replaceFunction, "sync of %s failed: %s", place.c_str(),
                             errorText(-ordered));
     if (const auto moved = _moveItemAtURLToDeathRow(progress.stagingUrl, StartDeletionThread::no); !moved)
@@ -318,34 +327,45 @@ Result<void> ZORClientConnection::_recoverFromReplaceOperationsWithError() {
     return {};
 }
 
+Result<void> ZORClientConnection::moveBack(const ReplaceJournal& journal, const FileURL& journalUrl) {
+    const Log& log = services_.log;
+    const Here here{recoverFunction, __LINE__};
+    ZORFileManager& fileManager = services_.fileManager;
+    const auto failed = [&](const ZORError* cause) {
+        return makeError(log, here, ErrorCode::journalUnusable, cause, LogFlag::yes,
+                         "Failed to recover replace move: %s to %s", journal.stagingUrl.c_str(),
+                         journal.oldUrl.c_str());
+    };
+    // What cannot be examined may be there or not. The journal waits for a launch that can tell.
+    if (!fileManager.itemDoesNotExistAtURL(journal.oldUrl) || !fileManager.itemDoesNotExistAtURL(journal.destUrl))
+        return failed(nullptr);
+    if (fileManager.itemDoesNotExistAtURL(journal.stagingUrl)) {
+        log.write(logLevelError, recoverFunction, "Nothing is left of the replace of %s", journalUrl.c_str());
+        return {};
+    }
+    if (log.writes(logLevelDebug))
+        log.write(logLevelDebug, recoverFunction, "Recovering from failed replace by moving: %s to %s",
+                  journal.stagingUrl.c_str(), journal.oldUrl.c_str());
+    if (const auto moved = fileManager.moveItemAtURL(journal.stagingUrl, journal.oldUrl); !moved)
+        return failed(&moved.error());
+    // On the disk before the journal can be gone.
+    if (orderBetween(journal.oldUrl.deletingLastPathComponent(), services_.configuration.replaceDirectory()) < 0)
+        return failed(nullptr);
+    return {};
+}
+
 Result<void> ZORClientConnection::recoverReplace(const FileURL& journalUrl) {
     const Log& log = services_.log;
     const Here here{recoverFunction, __LINE__};
     ZORFileManager& fileManager = services_.fileManager;
-    const auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(log, fileManager, journalUrl);
+    auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(log, fileManager, journalUrl);
     if (journal) {
+        journal->moveToRoot(fileManager.resolver().root().canonicalPath(), services_.configuration.stagingDirectory());
         if (log.writes(logLevelDebug))
             log.write(logLevelDebug, recoverFunction, "Doing a replace of %s with info: %s", journalUrl.c_str(),
                       journal->text().c_str());
-        // What cannot be examined counts as there: a move onto it could not be undone.
-        const bool moveBack =
-            fileManager.itemDoesNotExistAtURL(journal->oldUrl) && fileManager.itemDoesNotExistAtURL(journal->destUrl);
-        if (moveBack && fileManager.itemDoesNotExistAtURL(journal->stagingUrl)) {
-            log.write(logLevelError, recoverFunction, "Nothing is left of the replace of %s", journalUrl.c_str());
-        } else if (moveBack) {
-            if (log.writes(logLevelDebug))
-                log.write(logLevelDebug, recoverFunction, "Recovering from failed replace by moving: %s to %s",
-                          journal->stagingUrl.c_str(), journal->oldUrl.c_str());
-            if (const auto moved = fileManager.moveItemAtURL(journal->stagingUrl, journal->oldUrl); !moved)
-                return makeError(log, here, ErrorCode::journalUnusable, &moved.error(), LogFlag::yes,
-                                 "Failed to recover replace move: %s to %s", journal->stagingUrl.c_str(),
-                                 journal->oldUrl.c_str());
-            const auto directory = fileManager.resolver().openDirectory(journal->oldUrl.deletingLastPathComponent());
-            const int ordered = directory ? services_.durability.beforeRemoval(directory->get()) : -directory.error();
-            if (ordered < 0)
-                return makeError(log, here, ErrorCode::replaceCleanUpFailed, nullptr, LogFlag::yes,
-                                 "Failed to remove replace file at %s", journalUrl.c_str());
-        }
+        if (!fileManager.itemExistsAtURL(journal->oldUrl) && !fileManager.itemExistsAtURL(journal->destUrl))
+            TRY(moveBack(*journal, journalUrl));
     }
     if (const auto moved = _moveItemAtURLToDeathRow(journalUrl, StartDeletionThread::no); !moved)
         return makeError(log, here, ErrorCode::replaceCleanUpFailed, &moved.error(), LogFlag::yes,

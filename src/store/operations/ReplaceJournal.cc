@@ -65,6 +65,21 @@ Result<ReplaceJournal> ReplaceJournal::_readAndValidateReplaceFileAtUrl(const Lo
     return ReplaceJournal{.oldUrl = urls[0], .newUrl = urls[1], .stagingUrl = urls[2], .destUrl = urls[3]};
 }
 
+void ReplaceJournal::moveToRoot(const std::string& rootPath, const FileURL& stagingDirectory) {
+    const std::string root = rootPath == "/" ? "" : rootPath;
+    const std::string tail =
+        stagingDirectory.path().substr(root.size()) + "/" + std::string(stagingUrl.lastPathComponent());
+    const std::string& staging = stagingUrl.path();
+    if (!staging.ends_with(tail))
+        return;
+    const std::string oldRoot = staging.substr(0, staging.size() - tail.size());
+    if (oldRoot == root)
+        return;
+    for (FileURL* url : {&oldUrl, &newUrl, &stagingUrl, &destUrl})
+        if (url->path().starts_with(oldRoot + "/"))
+            *url = FileURL::directory(root + url->path().substr(oldRoot.size()));
+}
+
 std::string ReplaceJournal::text() const {
     return "old: " + oldUrl.path() + ", new: " + newUrl.path() + ", staging: " + stagingUrl.path() +
            ", dest: " + destUrl.path();
