@@ -59,7 +59,7 @@ std::string shown(const std::optional<UUID>& uuid) {
 Result<void> ZORClientConnection::replaceContainer(const ReplaceRequest& request,
                                                    StartDeletionThread startDeletionThread) {
     ReplaceProgress progress;
-    const auto swapped = [&]() -> Result<void> {
+    auto swapped = [&]() -> Result<void> {
         TRY(checkReplace(request));
         const AllIdentifiersLock lock(services_.locks, LockMode::writing);
         Result<void> result;
