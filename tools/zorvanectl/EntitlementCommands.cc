@@ -4,24 +4,31 @@
 #include "RegisteredEntitlements.h"
 
 #include <cstdio>
+#include <memory>
 
 namespace zorvanectl {
 
 namespace {
 
+struct CloseFile {
+    void operator()(std::FILE* file) const {
+        if (file != stdin)
+            std::fclose(file);
+    }
+};
+
 /// Everything that a file holds; nullopt when it cannot be read.
 std::optional<std::string> contentOf(const std::string& file) {
-    std::FILE* input = file == "-" ? stdin : std::fopen(file.c_str(), "re");
+    const std::unique_ptr<std::FILE, CloseFile> input(file == "-" ? stdin : std::fopen(file.c_str(), "re"));
     if (!input)
         return std::nullopt;
     std::string content;
     char buffer[4096];
-    while (const std::size_t count = std::fread(buffer, 1, sizeof buffer, input))
+    for (std::size_t count = sizeof buffer; count == sizeof buffer;) {
+        count = std::fread(buffer, 1, sizeof buffer, input.get());
         content.append(buffer, count);
-    const bool failed = std::ferror(input) != 0;
-    if (input != stdin)
-        std::fclose(input);
-    return failed ? std::nullopt : std::optional(std::move(content));
+    }
+    return std::ferror(input.get()) ? std::nullopt : std::optional(std::move(content));
 }
 
 /// The object in a file; nullopt, said on standard error, when there is none.
