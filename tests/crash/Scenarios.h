@@ -19,6 +19,8 @@ struct Scenario {
     /// Whether the daemon that met an error must serve the requests at once. A daemon cannot be asked for what a test
     /// took from under it.
     bool goesOnAfterErrors = true;
+    /// Calls of act that change or sync the disk, at the least: less means that nothing was tested.
+    std::size_t pointsMin = 6;
     /// Judges what only this scenario knows of; after a restart. `acted` when act came to its end without an error.
     std::function<std::string(const std::string& root, bool acted)> also;
 };
@@ -27,6 +29,8 @@ struct Scenario {
 std::vector<Scenario> storeScenarios();
 /// Those that work in the user's home.
 std::vector<Scenario> homeScenarios();
+/// Deletion, the loss of last references, and the first use of groups. They work in the user's home too.
+std::vector<Scenario> deletionScenarios();
 /// As test names are spelled.
 std::string scenarioName(const ::testing::TestParamInfo<Scenario>& parameter);
 

@@ -329,6 +329,11 @@ TEST_F(Deletion, OwnersWhoSwapContainers) {
             (void)stageBatch(one(container));
             world.disk().disarm();
             EXPECT_TRUE(swapped);
+            // Moved is gone, whatever lies there now.
+            const std::string victim = "victim";
+            const auto known =
+                world.services().cache().containerForUser(mobile, ContainerClass::dataApplication, &victim, false);
+            EXPECT_TRUE(inPlace || (!known && known.error().is(ErrorCode::notFound)));
             EXPECT_EQ(pass(), ErrorCode::success);
             EXPECT_EQ(world.read("outside/" + name + "/precious"), "kept");
             // As it was.
