@@ -2,6 +2,7 @@
 #include "zorvane-run/Mounts.h"
 #include "support/FileTree.h"
 
+#include <algorithm>
 #include <filesystem>
 #include <functional>
 #include <gtest/gtest.h>

@@ -2,6 +2,7 @@
 #include "upcall/packbuff/Packbuff.h"
 #include "zorvane-run/ToldContainers.h"
 
+#include <algorithm>
 #include <functional>
 #include <gtest/gtest.h>
 
