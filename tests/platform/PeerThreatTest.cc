@@ -62,7 +62,7 @@ public:
         const bool ready =
             (!prepare || prepare()) && (connects == Connects::no || server.connect(connection.get()) == 0);
         if (ready)
-            ::execl(program.c_str(), program.c_str(), "-c", "while :; do sleep 60; done", nullptr);
+            ::execl(program.c_str(), program.c_str(), "-c", "kill -STOP $$", nullptr);
         ::_exit(1);
     }
     ~Process() { end(); }
