@@ -17,6 +17,8 @@ std::vector<Figure> measureRegistration(const Settings& settings);
 std::vector<Figure> measureThroughput(const Settings& settings);
 /// The kernel's agent asks for the containers of a process: UpcallBench.cc.
 std::vector<Figure> measureUpcall(const Settings& settings);
+/// A program is started in its sandbox: RunBench.cc.
+std::vector<Figure> measureRun(const Settings& settings);
 /// Containers are made: CreateBench.cc.
 std::vector<Figure> measureCreate(const Settings& settings);
 /// The first look into a class with many containers: ClassBench.cc.

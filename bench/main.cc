@@ -29,7 +29,7 @@ Measures the daemon beside this program and prints each figure with its goal.
 
   --quick       fewer repetitions and smaller stores; under a minute
   --only NAME   one group: lookup, registration, throughput, upcall, create, class,
-                start, endurance
+                start, endurance, run
   --json FILE   write the figures to FILE, too
 
 As root it measures on file systems made for the run; others use a directory.
@@ -46,10 +46,15 @@ struct Group {
     std::vector<Figure> (*measure)(const Settings&);
 };
 constexpr Group groups[] = {
-    {"lookup", measureLookup},         {"registration", measureRegistration},
-    {"throughput", measureThroughput}, {"upcall", measureUpcall},
-    {"create", measureCreate},         {"class", measureClass},
-    {"start", measureStart},           {"endurance", measureEndurance},
+    {"lookup", measureLookup},
+    {"registration", measureRegistration},
+    {"throughput", measureThroughput},
+    {"upcall", measureUpcall},
+    {"create", measureCreate},
+    {"class", measureClass},
+    {"start", measureStart},
+    {"endurance", measureEndurance},
+    {"run", measureRun},
 };
 
 [[noreturn]] void endWithUsage(const std::string& what) {

@@ -1,0 +1,143 @@
+// SPDX-License-Identifier: Apache-2.0
+// Starting a program in its sandbox, from the start of zorvane-run to the program's end, against bubblewrap alone with
+// the same mounts.
+#include "Benchmarks.h"
+
+#include "entitlements/ZOREntitlementMapping.h"
+#include "ipc/Keys.h"
+#include "platform/linux/Names.h"
+#include "plist/Binary.h"
+
+#include <array>
+#include <cstdio>
+#include <fcntl.h>
+#include <fstream>
+#include <nlohmann/json.hpp>
+#include <unistd.h>
+
+namespace zor::bench {
+
+namespace {
+
+constexpr const char* identifier = "com.example.application.run";
+constexpr const char* bubblewrap = "/usr/bin/bwrap";
+constexpr const char* program = "/bin/true";
+
+void admitLauncher(const std::string& root, const std::string& launcher) {
+    const plist::Dictionary entry{{"Identifier", "com.veltra.zorvane-run"},
+                                  {"Executable", launcher},
+                                  {"KernelAgent", true},
+                                  {"Entitlements", plist::Dictionary()}};
+    const auto bytes = plist::writeBinary(entry);
+    if (!bytes)
+        throw Failure("a registry entry cannot be written");
+    std::ofstream file(root + "/" + platform::names::identityDirectory + "/run" + platform::names::identityFileSuffix,
+                       std::ios::binary);
+    file.write(reinterpret_cast<const char*>(bytes->data()), static_cast<std::streamsize>(bytes->size()));
+    file.close();
+    if (!file)
+        throw Failure("a registry entry cannot be written");
+}
+
+void registerGroups(const Daemon& daemon) {
+    Client client = daemon.connect();
+    const auto reply = client.exchange(requestFrame({
+        {std::string(ipc::keys::command), static_cast<std::uint64_t>(ipc::Command::processEntitlements)},
+        {std::string(ipc::keys::identifier), identifier},
+        {std::string(ipc::keys::entitlements),
+         plist::Dictionary{{std::string(entitlementKeys::applicationGroups), plist::Array{"group.one", "group.two"}}}},
+    }));
+    if (replyOf(reply).unsignedInteger(ipc::keys::replyError) != ipc::replySuccess)
+        throw Failure("a registration failed");
+}
+
+std::vector<std::string> launch(const std::string& launcher, const std::string& root) {
+    return {launcher, "--root", root, "--identifier", identifier, "--user", std::to_string(userId), "--", program};
+}
+
+/// What a program writes to its standard output; a failure unless it ends well.
+std::string outputOf(const std::vector<std::string>& command) {
+    std::string line;
+    for (const std::string& word : command)
+        line += "'" + word + "' ";
+    std::FILE* output = ::popen(line.c_str(), "re");
+    if (!output)
+        failWithErrno("popen");
+    std::string text;
+    std::array<char, 4096> buffer{};
+    while (const std::size_t count = std::fread(buffer.data(), 1, buffer.size(), output))
+        text.append(buffer.data(), count);
+    if (::pclose(output) != 0)
+        throw Failure(command.front() + " failed");
+    return text;
+}
+
+/// Bubblewrap with the mounts that the launcher says it would make.
+std::vector<std::string> bareCommand(std::vector<std::string> launcherCommand) {
+    launcherCommand.insert(launcherCommand.begin() + 1, {"--dry-run", "--json"});
+    const auto plan = nlohmann::json::parse(outputOf(launcherCommand));
+    std::vector<std::string> command = {
+        bubblewrap, "--unshare-pid", "--unshare-ipc", "--unshare-uts", "--new-session", "--die-with-parent",
+        "--proc",   "/proc",         "--dev",         "/dev",          "--tmpfs",       "/tmp"};
+    for (const auto& mount : plan.at("mounts")) {
+        const std::string path = mount.at("path");
+        if (mount.contains("linkTarget"))
+            command.insert(command.end(), {"--symlink", mount.at("linkTarget"), path});
+        else
+            command.insert(command.end(), {mount.at("writable") ? "--bind" : "--ro-bind", path, path});
+    }
+    command.insert(command.end(), {"--", program});
+    return command;
+}
+
+double milliseconds(const std::vector<std::string>& command) {
+    std::vector<char*> arguments;
+    for (const std::string& word : command)
+        arguments.push_back(const_cast<char*>(word.c_str()));
+    arguments.push_back(nullptr);
+    const auto begin = Clock::now();
+    ChildProcess child([&] { ::execv(arguments.front(), arguments.data()); });
+    if (child.wait() != 0)
+        throw Failure(command.front() + " failed");
+    return secondsSince(begin) * 1e3;
+}
+
+} // namespace
+
+std::vector<Figure> measureRun(const Settings& settings) {
+    Figure figure{.name = "run.start",
+                  .what = "a program started by zorvane-run, p50",
+                  .measured = "",
+                  .floor = "",
+                  .unit = "x",
+                  .goal = 1.5,
+                  .remark = "needs root and bubblewrap"};
+    const std::string launcher = settings.daemonProgram.substr(0, settings.daemonProgram.rfind('/')) + "/zorvane-run";
+    if (::geteuid() != 0 || ::access(bubblewrap, X_OK) != 0 || ::access(launcher.c_str(), X_OK) != 0)
+        return {figure};
+    const Place place(*settings.scratch, "run", {.bytes = std::uint64_t{256} << 20, .inodes = 16384});
+    prepareRoot(settings, place.path());
+    admitLauncher(place.path(), launcher);
+    const Daemon daemon(settings, place.path(), {});
+    registerGroups(daemon);
+    const auto command = launch(launcher, place.path());
+    const auto bare = bareCommand(command);
+    Pairs pairs;
+    const int runs = settings.rounds(100, 30);
+    for (int run = -2; run < runs; ++run) {
+        const double measured = milliseconds(command);
+        const double floor = milliseconds(bare);
+        if (run < 0) // warms up, and makes the containers
+            continue;
+        pairs.measured.push_back(measured);
+        pairs.floor.push_back(floor);
+    }
+    figure.measured = text("%.2f ms", pairs.measuredMedian());
+    figure.floor = text("%.2f ms", pairs.floorMedian());
+    figure.value = pairs.ratio();
+    figure.remark = "the floor is bubblewrap with the same mounts; a data and two group containers, /bin/true";
+    figure.numbers = {{"p50ms", pairs.measuredMedian()}, {"floorP50ms", pairs.floorMedian()}};
+    return {figure};
+}
+
+} // namespace zor::bench
