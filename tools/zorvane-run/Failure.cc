@@ -1,7 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Failure.h"
 
-#include <cstdio>
 #include <cstring>
 
 namespace zorvanerun {
@@ -9,21 +8,6 @@ namespace zorvanerun {
 std::string withReason(const std::string& what, int number) {
     const char* reason = strerrordesc_np(number);
     return what + ": " + (reason ? reason : "unknown error");
-}
-
-std::string printable(const std::string& text) {
-    std::string shown;
-    for (const char character : text) {
-        const auto byte = static_cast<unsigned char>(character);
-        if (byte >= 0x20 && byte != 0x7f) {
-            shown += character;
-            continue;
-        }
-        char escaped[8];
-        std::snprintf(escaped, sizeof escaped, "\\x%02x", byte);
-        shown += escaped;
-    }
-    return shown;
 }
 
 } // namespace zorvanerun

@@ -2,6 +2,8 @@
 // Why this program could not start another one: what happened and where, and what to do about it.
 #pragma once
 
+#include "zorvane/Text.h"
+
 #include <expected>
 #include <string>
 
@@ -18,8 +20,7 @@ using Result = std::expected<T, Failure>;
 
 /// "WHAT: what the errno means".
 [[nodiscard]] std::string withReason(const std::string& what, int number);
-/// Control characters shown as \xNN, so that a name cannot steer the terminal.
-[[nodiscard]] std::string printable(const std::string& text);
+using zorvane::printable;
 
 // Exit codes of the program's own; any other is that of the program it ran, 128 and the number for a signal.
 inline constexpr int exitDone = 0;

@@ -64,21 +64,6 @@ std::string shown(const zorvane::Value& value) {
 
 } // namespace
 
-std::string printable(const std::string& text) {
-    std::string shown;
-    for (const char character : text) {
-        const auto byte = static_cast<unsigned char>(character);
-        if (byte >= 0x20 && byte != 0x7f) {
-            shown += character;
-            continue;
-        }
-        char escaped[8];
-        std::snprintf(escaped, sizeof escaped, "\\x%02x", byte);
-        shown += escaped;
-    }
-    return shown;
-}
-
 void Output::json(const nlohmann::json& document) const {
     std::printf("%s\n", dumped(document).c_str());
 }

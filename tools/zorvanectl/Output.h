@@ -4,6 +4,7 @@
 #pragma once
 
 #include "zorvane/Client.h"
+#include "zorvane/Text.h"
 
 #include <cstdint>
 #include <nlohmann/json.hpp>
@@ -47,7 +48,6 @@ private:
 [[nodiscard]] std::optional<zorvane::Value> fromJson(const nlohmann::json& json);
 /// "1.4 MiB".
 [[nodiscard]] std::string shownBytes(std::uint64_t bytes);
-/// Control characters shown as \xNN, so that a name cannot steer the terminal.
-[[nodiscard]] std::string printable(const std::string& text);
+using zorvane::printable;
 
 } // namespace zorvanectl
