@@ -8,6 +8,7 @@
 
 #include <cstring>
 #include <fcntl.h>
+#include <string_view>
 #include <utility>
 
 namespace zor {
@@ -51,20 +52,20 @@ Result<void> ContainerBuilder::_createTopLevelContainerDirectory() {
     return {};
 }
 
+int ContainerBuilder::madeBefore(std::string_view subdirectory) const {
+    for (std::size_t i = 0; i < subdirectories_.size(); ++i)
+        if (layout_.subdirectories[i] == subdirectory)
+            return subdirectories_[i].get();
+    return -1; // a layout that names it too late; making anything there fails
+}
+
 Result<void> ContainerBuilder::_createSubDirectories() {
     subdirectories_.reserve(layout_.subdirectories.size());
     for (const char* subdirectory : layout_.subdirectories) {
-        const char* slash = std::strrchr(subdirectory, '/');
-        FileDescriptor above; // of one that lies below another, which came before it
-        if (slash) {
-            const std::string path(subdirectory, slash);
-            auto opened = openBeneath(directory_.get(), path.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
-            if (!opened)
-                return subdirectoryError(ZOR_HERE, subdirectory, opened.error(), "opendir");
-            above = std::move(*opened);
-        }
-        const int parent = slash ? above.get() : directory_.get();
-        const char* name = slash ? slash + 1 : subdirectory;
+        const std::string_view path = subdirectory;
+        const std::size_t slash = path.rfind('/');
+        const int parent = slash == path.npos ? directory_.get() : madeBefore(path.substr(0, slash));
+        const char* name = subdirectory + (slash == path.npos ? 0 : slash + 1);
         if (const int made = disk_.makeDirectory(parent, name, closedMode); made < 0)
             return subdirectoryError(ZOR_HERE, subdirectory, -made, "mkdir");
         auto opened = openBeneath(parent, name, O_PATH | O_DIRECTORY | O_NOFOLLOW);

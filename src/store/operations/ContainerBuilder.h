@@ -17,6 +17,7 @@
 #include "store/operations/ContainerLayout.h"
 
 #include <string>
+#include <string_view>
 #include <vector>
 
 namespace zor {
@@ -40,6 +41,8 @@ public:
     Result<void> orderBeforeMove(const fs::Durability& durability);
 
 private:
+    /// The descriptor of a subdirectory that a deeper one lies in: the layout names it first.
+    [[nodiscard]] int madeBefore(std::string_view subdirectory) const;
     ZORError topLevelError(Here here, int number, const char* verb);
     ZORError subdirectoryError(Here here, const char* subdirectory, int number, const char* verb);
     Result<void> attributesOf(int directory, mode_t mode, std::uint32_t owner, const char* subdirectory);
