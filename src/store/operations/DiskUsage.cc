@@ -6,6 +6,7 @@
 // long as it is walked. The container is looked up and opened under its lock, and walked on that descriptor; the result
 // is kept only if the lock, taken again, finds the same container at the same place.
 #include "daemon/ZORClientConnection.h"
+#include "platform/BlockingScope.h"
 #include "store/StoreServices.h"
 
 #include <cerrno>
@@ -61,7 +62,10 @@ Result<std::uint64_t> ZORClientConnection::diskUsage(const ContainerAddress& add
         container = record->url();
         directory = services_.fileManager.resolver().openDirectory(container);
     }
-    const std::uint64_t bytes = services_.fileManager.diskUsageOfDirectory(directory, container);
+    const std::uint64_t bytes = [&] {
+        const platform::BlockingScope blocking; // a large tree must not take one of the few threads from all clients
+        return services_.fileManager.diskUsageOfDirectory(directory, container);
+    }();
     if (isBundle)
         keepDiskUsage(address, container, bytes);
     return bytes;
