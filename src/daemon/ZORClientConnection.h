@@ -211,6 +211,7 @@ private:
     std::optional<ZORError> syncDirectories(std::vector<FileURL> changed);
 
     Result<void> checkReplace(const ReplaceRequest& request);
+    Result<void> checkedReplace(const ReplaceRequest& request, StartDeletionThread startDeletionThread);
     struct ReplaceProgress;
     Result<void> swapContainers(const ReplaceRequest& request, ReplaceProgress& progress);
     Result<void> prepareReplace(const ReplaceRequest& request, ReplaceProgress& progress);

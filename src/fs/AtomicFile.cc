@@ -20,8 +20,10 @@ namespace {
 constexpr std::size_t randomCharacters = 6;
 constexpr int namesTriedMax = 16;
 
+constexpr std::string_view temporaryMark = ".new-";
+
 std::string temporaryPrefix(const std::string& name) {
-    return "." + name + ".new-";
+    return "." + name + std::string(temporaryMark);
 }
 
 /// What stops before their rename left of earlier writes of the same target.
@@ -40,6 +42,12 @@ void removeLeftovers(platform::Disk& disk, int directory, const std::string& pre
 }
 
 } // namespace
+
+bool isWriteLeftover(std::string_view name) {
+    const std::size_t suffix = temporaryMark.size() + randomCharacters;
+    return name.starts_with('.') && name.size() > suffix &&
+           name.substr(name.size() - suffix).starts_with(temporaryMark);
+}
 
 std::string uniqueName(std::string prefix) {
     static constexpr char alphabet[] = "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789_-";

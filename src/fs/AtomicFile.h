@@ -12,6 +12,7 @@
 #include <cstdint>
 #include <span>
 #include <string>
+#include <string_view>
 #include <sys/types.h>
 
 namespace zor::fs {
@@ -20,6 +21,9 @@ namespace zor::fs {
 /// `mode` is set whatever the process's mask; the file belongs to the daemon.
 [[nodiscard]] int replaceFileDurably(platform::Disk& disk, int directory, const std::string& name, mode_t mode,
                                      std::span<const std::uint8_t> bytes);
+
+/// Whether a file of this name is what a write that was cut short left.
+[[nodiscard]] bool isWriteLeftover(std::string_view name);
 
 /// A new file with the content, not synced. Its descriptor, or a negative errno with nothing left behind but perhaps
 /// the file.

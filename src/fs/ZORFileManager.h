@@ -75,6 +75,8 @@ public:
     Result<std::vector<FileURL>> urlsForItemsInDirectoryAtURL(const FileURL& directory);
     /// What moves across file systems that were cut short left in a directory. Empty when it cannot be read.
     std::vector<FileURL> copyLeftoversInDirectoryAtURL(const FileURL& directory);
+    /// The same for files whose atomic writing was cut short.
+    std::vector<FileURL> writeLeftoversInDirectoryAtURL(const FileURL& directory);
     /// To the log, one line an entry.
     void printDirectoryStructureAtURL(const FileURL& url);
     /// Allocated bytes of everything below that is no directory, hard links once.
@@ -108,6 +110,8 @@ private:
     Result<bool> sourceIsMissing(const FileURL& source);
     /// Copies beside the destination and renames, so that a partial copy never has the final name.
     Result<void> copyTree(const FileURL& source, const FileURL& destination);
+
+    std::vector<FileURL> itemsNamed(const FileURL& directory, bool (*belongs)(std::string_view name)) const;
 
     Result<void> makeNewDirectory(const FileURL& url, Intermediates intermediates,
                                   const DirectoryAttributes& attributes);

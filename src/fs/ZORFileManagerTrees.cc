@@ -274,17 +274,25 @@ Result<std::vector<FileURL>> ZORFileManager::urlsForItemsInDirectoryAtURL(const 
     return urls;
 }
 
-std::vector<FileURL> ZORFileManager::copyLeftoversInDirectoryAtURL(const FileURL& directory) {
-    std::vector<FileURL> leftovers;
+std::vector<FileURL> ZORFileManager::itemsNamed(const FileURL& directory, bool (*belongs)(std::string_view)) const {
+    std::vector<FileURL> items;
     const auto opened = resolver_.openDirectory(directory);
     if (!opened)
-        return leftovers;
+        return items;
     fs::BulkDirectoryRead::Buffer buffer;
     fs::BulkDirectoryRead entries(opened->get(), buffer);
     while (const auto* entry = entries.next())
-        if (std::string_view(entry->name).starts_with(copyPrefix))
-            leftovers.push_back(directory.appendingDirectory(entry->name));
-    return leftovers;
+        if (belongs(entry->name))
+            items.push_back(directory.appendingDirectory(entry->name));
+    return items;
+}
+
+std::vector<FileURL> ZORFileManager::copyLeftoversInDirectoryAtURL(const FileURL& directory) {
+    return itemsNamed(directory, [](std::string_view name) { return name.starts_with(copyPrefix); });
+}
+
+std::vector<FileURL> ZORFileManager::writeLeftoversInDirectoryAtURL(const FileURL& directory) {
+    return itemsNamed(directory, fs::isWriteLeftover);
 }
 
 void ZORFileManager::printDirectoryStructureAtURL(const FileURL& url) {

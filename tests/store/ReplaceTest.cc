@@ -5,6 +5,7 @@
 #include "world/World.h"
 
 #include <gtest/gtest.h>
+#include <stdexcept>
 #include <unistd.h>
 
 namespace zor::test {
@@ -223,6 +224,44 @@ TEST_F(Replace, AFailedStepLeavesWhatItMust) {
         ASSERT_TRUE(record);
         EXPECT_EQ((*record)->uuid(), fresh.uuid);
         EXPECT_EQ(world.read(relative(fresh.path) + "/content"), "new");
+    }
+}
+
+// Goal: what the library throws ends at the operation, wherever it is thrown: error 40, no lock left, and one whole
+// container of the identifier. Method: a disk that throws at the N-th call until a replace meets none.
+TEST_F(Replace, AnExceptionAnywhereIsAnError) {
+    bool threw = true;
+    for (int point = 1; threw; ++point) {
+        SCOPED_TRACE(point);
+        ASSERT_LT(point, 200);
+        const std::string identifier = "com.example." + std::to_string(point);
+        const FoundContainer old = make(identifier, false, "old");
+        const FoundContainer fresh = make(identifier, true, "new");
+        int calls = 0;
+        world.disk().arm({.point = 10'000, .error = EIO, .filter = [&](const DiskCallInfo&) -> bool {
+                              if (++calls == point)
+                                  throw std::runtime_error("thrown by the test");
+                              return false;
+                          }});
+        const auto replaced = replace(swap(&old, fresh));
+        world.disk().disarm();
+        threw = calls >= point;
+        ASSERT_EQ(replaced.has_value(), !threw);
+        if (threw) {
+            EXPECT_TRUE(replaced.error().is(ErrorCode::exceptionCaught)) << replaced.error().text();
+        }
+        EXPECT_EQ(world.services().locks().identifiersInUse(), 0U);
+        world.restart();
+        world.daemonsClient().containerManagerSetup();
+        world.drainDeathRow();
+        const auto found = find(identifier);
+        const bool freshWaits =
+            world.services().cache().containerForUser(mobile, application, &identifier, true).has_value();
+        EXPECT_TRUE(found || freshWaits);
+        if (found) {
+            EXPECT_FALSE(contentOf(*found).empty());
+        }
+        EXPECT_TRUE(nothingIsUnderWay());
     }
 }
 

@@ -7,6 +7,7 @@
 //   stopped after                      | on the disk                              | recovery
 //   -----------------------------------|------------------------------------------|----------------------------------
 //   the new one got the old UUID       | both in place                            | none; a transient one is discarded
+//   the journal was half written       | the same, and a hidden file              | the file goes
 //   the journal was written            | journal, both in place                   | journal goes; nothing has happened
 //   the old one moved to staging       | journal, old and destination missing     | old moves back; nothing has
 //   happened the new one moved into place       | journal, destination there, old waiting  | journal goes, staging is
@@ -58,9 +59,16 @@ std::string shown(const std::optional<UUID>& uuid) {
 
 Result<void> ZORClientConnection::replaceContainer(const ReplaceRequest& request,
                                                    StartDeletionThread startDeletionThread) {
+    // What is thrown while containers move is dealt with where it happens; the rest has nothing to recover.
+    return services_.boundary.run({replaceFunction, __LINE__},
+                                  [&] { return checkedReplace(request, startDeletionThread); });
+}
+
+Result<void> ZORClientConnection::checkedReplace(const ReplaceRequest& request,
+                                                 StartDeletionThread startDeletionThread) {
     ReplaceProgress progress;
+    TRY(checkReplace(request));
     auto swapped = [&]() -> Result<void> {
-        TRY(checkReplace(request));
         const AllIdentifiersLock lock(services_.locks, LockMode::writing);
         Result<void> result;
         try {
@@ -299,11 +307,15 @@ std::optional<ZORError> ZORClientConnection::cleanUpReplace(const ReplaceProgres
     }
     if (!progress.oldRecord || progress.journalUrl.empty())
         return failed;
-    // The moves are on the disk before the journal can be gone.
+    // The moves are on the disk before the journal can be gone. Where that cannot be, it stays for the next launch,
+    // which finds what has moved.
     const FileURL place = progress.destUrl.deletingLastPathComponent();
-    if (const int ordered = orderBetween(place, services_.configuration.replaceDirectory()); ordered < 0)
-        services_.log.write(logLevelError, replaceFunction, "sync of %s failed: %s", place.c_str(),
-                            errorText(-ordered));
+    if (const int ordered = orderBetween(place, services_.configuration.replaceDirectory()); ordered < 0) {
+        const ZORError cause = posixError({replaceFunction, __LINE__}, -ordered, "sync of %s failed: %s", place.c_str(),
+                                          errorText(-ordered));
+        return makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &cause,
+                         LogFlag::yes, "Failed to remove replace file: %s", progress.journalUrl.c_str());
+    }
     if (const auto moved = _moveItemAtURLToDeathRow(progress.stagingUrl, StartDeletionThread::no); !moved)
         failed = makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
                            LogFlag::yes, "Failed to remove staging dir: %s", progress.stagingUrl.c_str());
@@ -322,6 +334,9 @@ Result<void> ZORClientConnection::_recoverFromReplaceOperationsWithError() {
                                 replace.c_str(), items.error().text().c_str());
         return {};
     }
+    // A journal has its name for itself alone, so no later write removes what a stop left of this one's.
+    for (const FileURL& leftover : services_.fileManager.writeLeftoversInDirectoryAtURL(replace))
+        (void)_moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
     for (const FileURL& item : *items)
         TRY(recoverReplace(item));
     return {};
