@@ -80,6 +80,7 @@ Scenario going(const std::string& name, const std::vector<Request>& victims, std
                     victims](Device& device) { device.acted = act(device) && saysTheyAreGone(device, victims); },
             .requests = {},
             .pointsMin = 2,
+            .callsPerStateMax = 2,
             .also = [victims](const std::string& root, bool acted) { return judgeGone(root, acted, victims); }};
 }
 

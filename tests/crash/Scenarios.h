@@ -21,6 +21,9 @@ struct Scenario {
     bool goesOnAfterErrors = true;
     /// Calls of act that change or sync the disk, at the least: less means that nothing was tested.
     std::size_t pointsMin = 6;
+    /// Calls for each state that a power cut may leave, at the most: a call that only syncs leaves what the one before
+    /// it left, and where few others are made that counts.
+    std::size_t callsPerStateMax = 1;
     /// Judges what only this scenario knows of; after a restart. `acted` when act came to its end without an error.
     std::function<std::string(const std::string& root, bool acted)> also;
 };

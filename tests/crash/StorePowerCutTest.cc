@@ -2,7 +2,6 @@
 #include "crash/Scenarios.h"
 #include "support/PowerCut.h"
 
-#include <cstdlib>
 #include <gtest/gtest.h>
 
 namespace zor::support {
@@ -14,8 +13,7 @@ std::string inRoot(const std::string& path, const std::string& oldRoot, const st
 
 void loopOverCuts(const Scenario& scenario, DiskModel model, Home home = Home::onRoot) {
     // Two file systems have the product of each one's states.
-    const std::size_t changesAtHomeMax = std::getenv("ZORVANE_TEST_LONG") ? 4 : 2;
-    const std::size_t singleChangesMax = home == Home::mounted ? changesAtHomeMax : 24;
+    const std::size_t singleChangesMax = home == Home::mounted ? 4 : 24;
     const fs::Durability::Probe probe = model == DiskModel::unordered ? noOrderAnywhere : journalEverywhere;
     platform::LinuxDisk linuxDisk;
     Device device("/dev/shm", home);
@@ -50,8 +48,7 @@ void loopOverCuts(const Scenario& scenario, DiskModel model, Home home = Home::o
             return complaint;
         });
     EXPECT_EQ(report.complaint, "");
-    // A call that only syncs leaves what the one before it left.
-    EXPECT_GT(2 * report.examined, log.operations.size() - before.operations.size());
+    EXPECT_GT(scenario.callsPerStateMax * report.examined, log.operations.size() - before.operations.size());
 }
 
 // Goal: a power cut anywhere leaves no container half made under its final name and loses nothing acknowledged, on a
