@@ -89,7 +89,10 @@ public:
             script(socket.get(), request.id);
         });
     }
-    void leaveSocketBehind() { listening_.reset(); }
+    void leaveSocketBehind() {
+        thread_.join(); // it holds the socket for as long as it accepts
+        listening_.reset();
+    }
 
     [[nodiscard]] ConnectOptions options(std::uint32_t timeoutMilliseconds = 10'000) const {
         return {.root = made_[0], .timeoutMilliseconds = timeoutMilliseconds};

@@ -4,6 +4,7 @@
 #include <cstdlib>
 #include <dirent.h>
 #include <memory>
+#include <thread>
 #include <unistd.h>
 
 namespace zor::support {
@@ -34,7 +35,15 @@ std::size_t countThreads() {
 
 } // namespace
 
-ProcessResources::ProcessResources() : descriptors_(openDescriptors()), threads_(countThreads()) {}
+ProcessResources::ProcessResources() : descriptors_(openDescriptors()) {
+    // A sanitizer's runtime may have a thread of its own, which it starts with the first of ours.
+    static const bool runtimeStarted = [] {
+        std::thread([] {}).join();
+        ::usleep(10'000); // until the one that was joined is no longer listed
+        return true;
+    }();
+    threads_ = runtimeStarted ? countThreads() : 0;
+}
 
 std::string ProcessResources::leakedSince() const {
     std::string leaked;
