@@ -77,6 +77,7 @@ public:
                 .lockState = real.lockState,
                 .protection = real.protection,
                 .sandbox = real.sandbox,
+                .assertions = real.assertions,
                 .crash = real.crash,
                 .bootMarker = real.bootMarker,
                 .transactions = real.transactions,

@@ -36,7 +36,7 @@ constexpr std::array<ZORCommandTableRow, ipc::commandCount> rows = {{
     {Command::getSystemGroupContainerPaths, commands::getSystemGroupContainerPaths, none, now},
     {Command::getSystemGroupContainerPath, commands::getSystemGroupContainerPath, none, now},
     {Command::processEntitlements, commands::processEntitlements, allowed, now},
-    {Command::setDataProtection, commands::notServedYet, allowed, later},
+    {Command::setDataProtection, commands::setDataProtection, allowed, later},
     {Command::recreateDefaultStructure2, commands::recreateDefaultStructure, allowed, now},
     {Command::getDiskUsage, commands::getDiskUsage, allowed, now},
     {Command::retryTest, commands::retryTest, allowed, now},

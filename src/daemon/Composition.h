@@ -17,8 +17,10 @@
 #include "entitlements/ZORWhitelist.h"
 #include "fs/Durability.h"
 #include "fs/ZORFileManager.h"
+#include "migration/ZORContainerMigrator.h"
 #include "platform/Platform.h"
 #include "platform/RefusalLimiter.h"
+#include "protection/ZORDataProtectionManager.h"
 #include "store/StoreServices.h"
 #include "store/ZORContainerCache.h"
 #include "store/ZORGlobalConfiguration.h"
@@ -76,6 +78,8 @@ private:
         ZOREntitlementMapping entitlements;
         ZORGroupManager groups;
         ZORWhitelist whitelist;
+        ZORContainerMigrator migrator;
+        ZORDataProtectionManager dataProtection;
         StoreServices services;
         Dispatcher dispatcher;
         UpcallServer upcallServer;

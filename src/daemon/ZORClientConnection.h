@@ -187,7 +187,8 @@ public:
     // Setup (Setup.cc): before clients are served, on the thread that starts the daemon, without identifier locks.
     void rebootContainerManagerSetup();
     void containerManagerSetup();
-    void _cleanupOrphanedDataForUser(std::uint32_t userId, ContainerClass containerClass);
+    /// How many entries went.
+    std::uint64_t _cleanupOrphanedDataForUser(std::uint32_t userId, ContainerClass containerClass);
 
     // Sandbox mapping (SandboxMapping.cc).
     /// Removes the mapping, then sets it when there is a URL. False, logged, on failure.
@@ -237,9 +238,15 @@ private:
     std::optional<ZORError> deleteEverythingOnDeathRow();
     bool isOrphan(const FileURL& entry, ContainerClass containerClass);
     void reportOrphan(const FileURL& entry);
-    void sweepStaging();
+    // Passes of the setup; each gives the number of items it changed.
+    std::uint64_t migrateBundles();
+    std::uint64_t migrateWellknown();
+    std::uint64_t discardAtBoot(const std::optional<FileURL>& url, const char* what);
+    std::uint64_t cleanUpUsers();
+    std::uint64_t sweepStaging();
     /// Names in staging that journals on the disk still speak of.
     std::set<std::string, std::less<>> stagedByJournals();
+    std::size_t journalCount();
     void makeDirectoriesDurable();
 
     StoreServices& services_;

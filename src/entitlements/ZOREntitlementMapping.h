@@ -6,7 +6,7 @@
 // names begin with _onQueue_ run inside it and never enter it again.
 //
 // Storing and asking is in ZOREntitlementMapping.cc; what a change of entitlements makes of containers is in
-// ZOREntitlementProcessing.cc.
+// ZOREntitlementProcessing.cc; what a boot brings in line, in FirstBootPasses.cc.
 //
 // A stop during a save leaves the old file or the new one. A file that is there but cannot be read is moved aside,
 // never written over: as long as it lies there, nothing may be deleted because the map does not mention it (lostFile).
@@ -20,6 +20,7 @@
 #include "store/ZORGlobalConfiguration.h"
 
 #include <optional>
+#include <set>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -32,6 +33,10 @@ inline constexpr std::string_view childPluginBundleIds = "com.veltra.Zorvane.Chi
 // The flags are kept under the names of the options that set them.
 inline constexpr std::string_view registeredByCaller = ipc::keys::registeredByCallerOption;
 inline constexpr std::string_view placeholder = ipc::keys::placeholderOption;
+
+[[nodiscard]] constexpr bool isOne(std::string_view key) {
+    return key == childPluginBundleIds || key == registeredByCaller || key == placeholder;
+}
 } // namespace entitlementMapKeys
 
 /// Keys inside an identifier's entitlements.
@@ -89,6 +94,13 @@ public:
                                                  const std::vector<std::string>& identifiers)
         ZOR_EXCLUDES(entitlementQueue_);
 
+    // The first launch after a boot (FirstBootPasses.cc), before clients are served. Failures are logged and passed
+    // over. Both give the number of containers that they changed.
+    /// Moves the group identifiers that older systems kept in data containers into the map; once for the device.
+    std::uint64_t migrateAppGroupIdsFromDataContainersToFile() ZOR_EXCLUDES(entitlementQueue_);
+    /// Stages system containers that no identifier is entitled to for deletion.
+    std::uint64_t reconcileSystemContainers() ZOR_EXCLUDES(entitlementQueue_);
+
     /// Where an entitlement file that could not be read lies, while it does. Asked of the disk each time.
     [[nodiscard]] std::optional<FileURL> lostFile();
     [[nodiscard]] std::size_t entryCount() ZOR_EXCLUDES(entitlementQueue_);
@@ -134,6 +146,11 @@ private:
         ZOR_REQUIRES(entitlementQueue_);
     void _onQueue_stageFlag(StagedChange& staged, std::string_view key, const std::string& identifier,
                             const plist::Dictionary* options) const ZOR_REQUIRES(entitlementQueue_);
+    /// False, logged, on failure.
+    bool migrateGroupIdentifiers(const ZORMetadata& container) ZOR_EXCLUDES(entitlementQueue_);
+    /// nullopt, logged, when that cannot be known.
+    std::optional<std::set<std::string, std::less<>>> ownersOfSystemContainers() ZOR_EXCLUDES(entitlementQueue_);
+
     ErrorCode _onQueue_processEntitlements(const plist::Dictionary* entitlements, const std::string* identifier,
                                            const plist::Dictionary* options) ZOR_REQUIRES(entitlementQueue_);
     Result<void> _onQueue_process(const plist::Dictionary* entitlements, const std::string& identifier,

@@ -23,18 +23,13 @@ namespace {
 
 constexpr const char* processFunction = "_onQueue_processEntitlements";
 
-bool isReserved(std::string_view key) {
-    return key == entitlementMapKeys::childPluginBundleIds || key == entitlementMapKeys::registeredByCaller ||
-           key == entitlementMapKeys::placeholder;
-}
-
 const plist::Value* parentIn(const plist::Dictionary* options) {
     return options ? options->find(ipc::keys::parentBundleIdOption) : nullptr;
 }
 
 bool canBeProcessed(const std::string& identifier, const plist::Dictionary* options) {
     const plist::Value* parent = parentIn(options);
-    return !isReserved(identifier) && (!parent || parent->asString());
+    return !entitlementMapKeys::isOne(identifier) && (!parent || parent->asString());
 }
 
 /// What is stored under the map's own keys is the daemon's; anything else there counts as nothing.

@@ -133,7 +133,7 @@ void ZORGroupManager::_removeGroupContainersIfNeededforUser(std::uint32_t userId
     stageGroupContainer(__func__, userId, **record, UseLocking::no);
 }
 
-void ZORGroupManager::stageGroupContainer(const char* function, std::uint32_t userId, const ZORMetadata& record,
+bool ZORGroupManager::stageGroupContainer(const char* function, std::uint32_t userId, const ZORMetadata& record,
                                           UseLocking useLocking) {
     const auto staged = services_.sharedClientConnection->stageForDeleteContainersWithUsers(
         ZORClientConnection::DeletionBatch::of(userId, record.uuid(), record.identifier(), record.containerClass()),
@@ -141,35 +141,41 @@ void ZORGroupManager::stageGroupContainer(const char* function, std::uint32_t us
     if (!staged)
         log_.write(logLevelError, function, "Failed to destroy group container with identifier %s for %u: %llu",
                    ZOR_SHOWN(record.identifier()), userId, static_cast<unsigned long long>(staged.error().replyCode()));
+    return staged.has_value();
 }
 
-void ZORGroupManager::reconcileGroupContainersOfType(GroupType type) {
+std::uint64_t ZORGroupManager::reconcileGroupContainersOfType(GroupType type) {
     const auto references = _copyReferenceCountSetOfType(type, services_.entitlements.entitlementMappingDict());
     if (!references) {
         log_.write(logLevelError, __func__, "Failed to get reference count information for group type: %ld",
                    static_cast<long>(type));
-        return;
+        return 0;
     }
+    std::uint64_t removed = 0;
     forEachUser(type, [&](std::uint32_t userId) {
-        _cleanupUnreferencedGroupContainersForUser(userId, kindOf(type).containerClass, *references);
+        removed += _cleanupUnreferencedGroupContainersForUser(userId, kindOf(type).containerClass, *references);
     });
+    return removed;
 }
 
-void ZORGroupManager::_cleanupUnreferencedGroupContainersForUser(std::uint32_t userId, ContainerClass containerClass,
-                                                                 const References& references) {
+std::uint64_t ZORGroupManager::_cleanupUnreferencedGroupContainersForUser(std::uint32_t userId,
+                                                                          ContainerClass containerClass,
+                                                                          const References& references) {
     const auto records = services_.cache.allContainersForUser(userId, containerClass, false);
     if (!records) {
         log_.write(logLevelError, __func__, "Failed to fetch group container list for %u: %s", userId,
                    records.error().text().c_str());
-        return;
+        return 0;
     }
+    std::uint64_t removed = 0;
     for (const auto& record : *records) {
         if (references.contains(record->identifier()))
             continue;
         log_.write(logLevelError, __func__, "Removing group container with identifier %s for %u",
                    ZOR_SHOWN(record->identifier()), userId);
-        stageGroupContainer(__func__, userId, *record, UseLocking::yes);
+        removed += stageGroupContainer(__func__, userId, *record, UseLocking::yes) ? 1 : 0;
     }
+    return removed;
 }
 
 Result<ZORGroupManager::Paths> ZORGroupManager::groupContainerPathsForUser(std::uint32_t userId,

@@ -55,7 +55,7 @@ public:
     void handleChangeFromOldGroupContainerIds(Identifiers oldGroups, const Identifiers& newGroups, GroupType type,
                                               const std::string& identifier, const plist::Dictionary& map);
     /// Stages every group container that the map does not refer to. At the boot, before clients are served.
-    void reconcileGroupContainersOfType(GroupType type);
+    std::uint64_t reconcileGroupContainersOfType(GroupType type);
     /// Who refers to which group, as the deletions count it. Lists that do not count are said with LogFlag::yes.
     [[nodiscard]] References referencesIn(const plist::Dictionary& map, GroupType type, LogFlag logFlag) const;
 
@@ -68,9 +68,9 @@ private:
     void _removeGroupContainersIfNeededforUser(std::uint32_t userId, ContainerClass containerClass,
                                                const std::string& group, const std::string& identifier,
                                                const References& references);
-    void _cleanupUnreferencedGroupContainersForUser(std::uint32_t userId, ContainerClass containerClass,
-                                                    const References& references);
-    void stageGroupContainer(const char* function, std::uint32_t userId, const ZORMetadata& record,
+    std::uint64_t _cleanupUnreferencedGroupContainersForUser(std::uint32_t userId, ContainerClass containerClass,
+                                                             const References& references);
+    bool stageGroupContainer(const char* function, std::uint32_t userId, const ZORMetadata& record,
                              UseLocking useLocking);
     /// Every user that has groups of the type, and a home to have them in.
     void forEachUser(GroupType type, const std::function<void(std::uint32_t)>& function);

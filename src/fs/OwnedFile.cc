@@ -13,8 +13,8 @@ namespace zor::fs {
 namespace {
 
 /// EPERM for a file that somebody else may have written.
-int judge(const struct stat& status, std::size_t bytesMax) {
-    const bool trustedOwner = status.st_uid == 0 || status.st_uid == ::geteuid();
+int judge(const struct stat& status, std::size_t bytesMax, std::optional<uid_t> formerOwner) {
+    const bool trustedOwner = status.st_uid == 0 || status.st_uid == ::geteuid() || status.st_uid == formerOwner;
     if (!S_ISREG(status.st_mode) || status.st_nlink != 1 || !trustedOwner || (status.st_mode & (S_IWGRP | S_IWOTH)))
         return EPERM;
     return static_cast<std::size_t>(status.st_size) > bytesMax ? EFBIG : 0;
@@ -22,14 +22,15 @@ int judge(const struct stat& status, std::size_t bytesMax) {
 
 } // namespace
 
-std::expected<plist::Data, int> readOwnedFile(int directory, const char* path, std::size_t bytesMax) {
+std::expected<plist::Data, int> readOwnedFile(int directory, const char* path, std::size_t bytesMax,
+                                              std::optional<uid_t> formerOwner) {
     const auto file = platform::openBeneath(directory, path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
     if (!file)
         return std::unexpected(file.error());
     struct stat status{};
     if (::fstat(file->get(), &status) != 0)
         return std::unexpected(errno);
-    if (const int refused = judge(status, bytesMax))
+    if (const int refused = judge(status, bytesMax, formerOwner))
         return std::unexpected(refused);
     // One byte more than it had tells a file that grows while it is read from one that was read whole.
     plist::Data bytes(static_cast<std::size_t>(status.st_size) + 1);

@@ -6,6 +6,8 @@
 
 #include <cstddef>
 #include <expected>
+#include <optional>
+#include <sys/types.h>
 
 namespace zor::fs {
 
@@ -14,9 +16,11 @@ inline constexpr std::size_t metadataFileBytesMax = std::size_t{1} << 20;
 
 /// The whole of a file, or an errno. `path` is relative to `directory` and resolved without following a link.
 ///
-/// The file must be regular, have one link, belong to root or the daemon's user, not be writable by group or others,
-/// and hold at most `bytesMax`; else EPERM or EFBIG. Opening cannot block, whatever is found there. Any thread.
-[[nodiscard]] std::expected<plist::Data, int> readOwnedFile(int directory, const char* path, std::size_t bytesMax);
+/// The file must be regular, have one link, belong to root or the daemon's user (or to `formerOwner`, for files of an
+/// older system), not be writable by group or others, and hold at most `bytesMax`; else EPERM or EFBIG. Opening cannot
+/// block, whatever is found there. Any thread.
+[[nodiscard]] std::expected<plist::Data, int> readOwnedFile(int directory, const char* path, std::size_t bytesMax,
+                                                            std::optional<uid_t> formerOwner = std::nullopt);
 
 /// Whether `path` below `directory` is a regular file, reached without a link: 0, or an errno (EINVAL: something else).
 [[nodiscard]] int isRegularFile(int directory, const char* path);

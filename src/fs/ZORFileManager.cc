@@ -158,16 +158,40 @@ Result<void> ZORFileManager::setDataProtectionClassOfItemAtURL(const FileURL& ur
     const auto item = resolver_.openItem(url, O_RDONLY | O_NONBLOCK | O_NOCTTY);
     if (!item)
         return posixError(ZOR_HERE, item.error(), "Failed to open %s : %s", url.c_str(), errorText(item.error()));
+    return setClassOf(item->get(), url.path(), protectionClass, predicate);
+}
+
+Result<void> ZORFileManager::setDataProtectionClassOfEntry(const fs::WalkEntry& entry, const std::string& path,
+                                                           int protectionClass,
+                                                           const std::function<bool(int)>& predicate) {
+    if (entry.directory >= 0)
+        return setClassOf(entry.directory, path, protectionClass, predicate);
+    const auto item = platform::openBeneath(entry.parent, entry.name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
+    if (!item && (item.error() == ENOENT || item.error() == ELOOP || item.error() == ENXIO))
+        return {};
+    struct stat status{};
+    if (!item || ::fstat(item->get(), &status) != 0) {
+        const int number = item ? errno : item.error();
+        return posixError(ZOR_HERE, number, "Failed to open %s : %s", ZOR_SHOWN(path), errorText(number));
+    }
+    if (status.st_ino != entry.status.st_ino || status.st_dev != entry.status.st_dev)
+        return {};
+    return setClassOf(item->get(), path, protectionClass, predicate);
+}
+
+Result<void> ZORFileManager::setClassOf(int fd, const std::string& path, int protectionClass,
+                                        const std::function<bool(int)>& predicate) {
+    constexpr Here here{"setDataProtectionClassOfItemAtURL", __LINE__};
     if (predicate) {
-        const auto current = protection_.classOf(item->get());
+        const auto current = protection_.classOf(fd);
         if (!current)
-            return posixError(ZOR_HERE, current.error(), "Failed to getclass of file %s: %s", url.c_str(),
+            return posixError(here, current.error(), "Failed to getclass of file %s: %s", ZOR_SHOWN(path),
                               errorText(current.error()));
         if (!predicate(*current))
             return {};
     }
-    if (const int failure = protection_.setClass(item->get(), protectionClass))
-        return posixError(ZOR_HERE, failure, "Failed to setclass(%d) on file %s: %s", protectionClass, url.c_str(),
+    if (const int failure = protection_.setClass(fd, protectionClass))
+        return posixError(here, failure, "Failed to setclass(%d) on file %s: %s", protectionClass, ZOR_SHOWN(path),
                           errorText(failure));
     return {};
 }

@@ -93,6 +93,10 @@ public:
     /// `predicate` gets the current class and says whether to set; without one, always.
     Result<void> setDataProtectionClassOfItemAtURL(const FileURL& url, int protectionClass,
                                                    const std::function<bool(int)>& predicate = nullptr);
+    /// The same for a directory or regular file that a walk has met; `path` names it in messages. What is no longer
+    /// what the walk met is left alone, as if it had gone before.
+    Result<void> setDataProtectionClassOfEntry(const fs::WalkEntry& entry, const std::string& path, int protectionClass,
+                                               const std::function<bool(int)>& predicate);
 
     [[nodiscard]] const fs::PathResolver& resolver() const { return resolver_; }
     [[nodiscard]] platform::Disk& disk() { return disk_; }
@@ -113,6 +117,8 @@ private:
 
     std::vector<FileURL> itemsNamed(const FileURL& directory, bool (*belongs)(std::string_view name)) const;
 
+    Result<void> setClassOf(int fd, const std::string& path, int protectionClass,
+                            const std::function<bool(int)>& predicate);
     Result<void> makeNewDirectory(const FileURL& url, Intermediates intermediates,
                                   const DirectoryAttributes& attributes);
     Result<void> applyAttributes(int parent, const std::string& name, const std::string& path,

@@ -107,4 +107,14 @@ inline constexpr std::string_view statusEntitlementsLeftOut = "EntitlementsLeftO
 
 } // namespace keys
 
+/// Keys of a container's info that the system gives a meaning to.
+namespace infoKeys {
+/// u64, bytes: what a bundle was measured to take.
+inline constexpr std::string_view staticDiskUsage = "com.veltra.Brevance.StaticDiskUsage";
+/// Integer: the data-protection class that was asked for last; absent reads as 3.
+inline constexpr std::string_view contentProtectionClass = "com.veltra.Brevance.ContentProtectionClass";
+/// What older systems kept in a data container of the groups that its identifier is entitled to.
+inline constexpr std::string_view groupContainerIds = "com.veltra.Brevance.GroupContainerIDs";
+} // namespace infoKeys
+
 } // namespace zor::ipc

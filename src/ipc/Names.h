@@ -12,5 +12,9 @@ inline constexpr std::string_view upcallServiceName = "com.veltra.zorvaned.upcal
 inline constexpr std::string_view statusSocketName = "zorvaned.status";
 /// Holds the sockets.
 inline constexpr std::string_view runtimeDirectory = "run/zorvane";
+/// In it: a locked file for each program that must not be started now, named by its percent-encoded identifier.
+inline constexpr std::string_view assertionDirectory = "assertions";
+/// In it: whether the device is locked.
+inline constexpr std::string_view lockStateFile = "lockstate";
 
 } // namespace zor::ipc

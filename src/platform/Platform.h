@@ -15,6 +15,7 @@
 #include "platform/SandboxUserState.h"
 #include "platform/ServiceListener.h"
 #include "platform/ServiceTransaction.h"
+#include "platform/TerminationAssertionService.h"
 #include "platform/UpcallPort.h"
 #include "platform/WorkQueue.h"
 
@@ -33,6 +34,7 @@ struct Platform {
     DeviceLockState& lockState;
     FileProtectionClass& protection;
     SandboxUserState& sandbox;
+    TerminationAssertionService& assertions;
     CrashAnnotation& crash;
     BootMarker& bootMarker;
     ServiceTransactions& transactions;

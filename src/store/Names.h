@@ -15,6 +15,8 @@ inline constexpr std::string_view rootHome = "/private/var/root";
 inline constexpr std::string_view brevadHome = "/private/var/brevad";
 inline constexpr std::string_view sharedContainers = "/private/var/containers";
 inline constexpr std::string_view temporary = "/tmp";
+/// Where an older system kept the bundle containers too.
+inline constexpr std::string_view formerContainers = "/private/var/mobile/Containers";
 
 // Below a home.
 inline constexpr std::string_view logs = "Library/Logs/Zorvane";
@@ -38,5 +40,9 @@ inline constexpr const char* containerTemporary = "tmp";
 inline constexpr const char* entitlementFile = "zor_entitlements.plist";
 /// What an entitlement file that cannot be read is renamed to; its presence stops every pass that deletes on its word.
 inline constexpr const char* unreadableEntitlementFile = "zor_entitlements.plist.unreadable";
+
+/// In the library directory: what has been migrated, once for the device.
+inline constexpr std::string_view bundleMigrationMarker = "zor_bundle_migration_complete.plist";
+inline constexpr std::string_view groupIdMigrationMarker = "zor_group_id_migration_complete.plist";
 
 } // namespace zor::names

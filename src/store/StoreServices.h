@@ -9,7 +9,9 @@
 #include "platform/Queries.h"
 #include "platform/SandboxUserState.h"
 #include "platform/ServiceTransaction.h"
+#include "platform/TerminationAssertionService.h"
 #include "platform/WorkQueue.h"
+#include "store/SetupReport.h"
 #include "store/ZORContainerCache.h"
 #include "store/ZORGlobalConfiguration.h"
 
@@ -19,6 +21,8 @@
 namespace zor {
 
 class ZORClientConnection;
+class ZORContainerMigrator;
+class ZORDataProtectionManager;
 class ZOREntitlementMapping;
 class ZORGroupManager;
 class ZORWhitelist;
@@ -34,12 +38,17 @@ struct StoreServices {
     ZOREntitlementMapping& entitlements;
     ZORGroupManager& groups;
     const ZORWhitelist& whitelist;
+    ZORContainerMigrator& migrator;
+    ZORDataProtectionManager& dataProtection;
     const platform::InternalBuildQuery& internalBuild;
     platform::SandboxUserState& sandbox;
+    platform::TerminationAssertionService& assertions;
     platform::WorkQueue& deathRowQueue;
+    platform::WorkQueue& lockStateQueue;
     platform::ServiceTransactions& transactions;
     /// The daemon's own client. It is made over these services, so it comes last; nothing runs before it is there.
     std::shared_ptr<ZORClientConnection> sharedClientConnection;
+    SetupReport setup{};
 };
 
 /// Runs `job` later on a queue; the daemon counts as busy until it has run.

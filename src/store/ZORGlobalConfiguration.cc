@@ -26,7 +26,8 @@ ZORGlobalConfiguration::ZORGlobalConfiguration(const Log& log, ZORFileManager& f
     : log_(log), fileManager_(fileManager), passwords_(passwords), homeDirectory_(place(fileManager, names::rootHome)),
       brevadHomeDirectory_(place(fileManager, names::brevadHome)),
       sharedContainersDirectory_(place(fileManager, names::sharedContainers)),
-      temporaryDirectory_(place(fileManager, names::temporary)) {}
+      temporaryDirectory_(place(fileManager, names::temporary)),
+      formerContainersDirectory_(place(fileManager, names::formerContainers)) {}
 
 void ZORGlobalConfiguration::makeDirectory(const FileURL& url, const DirectoryAttributes& attributes,
                                            const char* function, const char* what, Intermediates intermediates) {
@@ -106,6 +107,14 @@ FileURL ZORGlobalConfiguration::bundleDirectory() {
     FileURL url = sharedContainersDirectory().appendingDirectory(names::bundle);
     makeDirectory(url, plainDirectory, __func__, "bundle dir");
     return url;
+}
+
+FileURL ZORGlobalConfiguration::formerBundleDirectory() const {
+    return formerContainersDirectory_.appendingDirectory(names::bundle);
+}
+
+FileURL ZORGlobalConfiguration::formerBundleDirectory(ContainerClass containerClass) const {
+    return formerContainersDirectory_.appendingDirectory(className(containerClass));
 }
 
 FileURL ZORGlobalConfiguration::transientBundleDirectory() {

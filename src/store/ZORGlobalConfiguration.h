@@ -40,6 +40,9 @@ public:
     FileURL deathrowDirectory();
     FileURL replaceDirectory();
     FileURL bundleDirectory();
+    /// Where an older system kept bundle containers, and those of one class; not made here.
+    [[nodiscard]] FileURL formerBundleDirectory() const;
+    [[nodiscard]] FileURL formerBundleDirectory(ContainerClass containerClass) const;
     /// DIR/tmp; the system's, not made here.
     [[nodiscard]] FileURL temporaryDirectory() const { return temporaryDirectory_; }
 
@@ -61,6 +64,7 @@ private:
     const FileURL brevadHomeDirectory_;
     const FileURL sharedContainersDirectory_;
     const FileURL temporaryDirectory_;
+    const FileURL formerContainersDirectory_;
     platform::RecursiveMutex lock_;
     std::map<std::uint32_t, std::unique_ptr<ZORPerUserConfiguration>> perUserConfigurations_ ZOR_GUARDED_BY(lock_);
 };

@@ -136,13 +136,14 @@ Result<std::shared_ptr<ZORMetadata>> parseMetadata(std::span<const std::uint8_t>
 }
 
 MetadataReader::MetadataReader(int directory, std::shared_ptr<const std::string> parentPath, std::uint32_t userId,
-                               CheckClassPath checkClassPath)
-    : directory_(directory), parentPath_(std::move(parentPath)), userId_(userId), checkClassPath_(checkClassPath) {}
+                               CheckClassPath checkClassPath, std::optional<uid_t> formerOwner)
+    : directory_(directory), parentPath_(std::move(parentPath)), userId_(userId), checkClassPath_(checkClassPath),
+      formerOwner_(formerOwner) {}
 
 Result<std::shared_ptr<ZORMetadata>> MetadataReader::read(const char* name) const {
     const ContainerPlace place(parentPath_, name);
     const std::string relative = std::string(name) + "/" + names::metadataFile;
-    const auto bytes = fs::readOwnedFile(directory_, relative.c_str(), fs::metadataFileBytesMax);
+    const auto bytes = fs::readOwnedFile(directory_, relative.c_str(), fs::metadataFileBytesMax, formerOwner_);
     if (!bytes) {
         const ZORError cause = posixError(ZOR_HERE, bytes.error(), "%s", errorText(bytes.error()));
         return ZORError(Here{"readAndValidateMetadataAtUrl", __LINE__}, ErrorDomain::zor,
@@ -155,12 +156,13 @@ Result<std::shared_ptr<ZORMetadata>> MetadataReader::read(const char* name) cons
 
 Result<std::shared_ptr<ZORMetadata>> readAndValidateMetadataAtUrl(const Log& log, ZORFileManager& fileManager,
                                                                   const FileURL& url, std::uint32_t userId,
-                                                                  CheckClassPath checkClassPath) {
+                                                                  CheckClassPath checkClassPath,
+                                                                  std::optional<uid_t> formerOwner) {
     const FileURL parent = url.deletingLastPathComponent();
     const auto directory = fileManager.resolver().openDirectoryPath(parent);
     // Without its directory, the read below says what is wrong with the container.
     const MetadataReader reader(directory ? directory->get() : -1, std::make_shared<const std::string>(parent.path()),
-                                userId, checkClassPath);
+                                userId, checkClassPath, formerOwner);
     auto record = reader.read(std::string(url.lastPathComponent()).c_str());
     if (!record)
         logError(log, record.error());

@@ -66,10 +66,11 @@ public:
     void setPlace(ContainerPlace place) { place_ = std::move(place); }
     [[nodiscard]] bool transient() const { return transient_; }
     void setTransient(bool transient) { transient_ = transient; }
-    [[nodiscard]] bool existed() const { return existed_; }
-    void setExisted(bool existed) { existed_ = existed; }
-    /// False from its creation until the move into its class directory has been synced; then true for ever. The one
-    /// field that is changed without the identifier locks.
+    /// Whether it was found rather than made, when it was last asked for. Set by lookups, which may be several at once.
+    [[nodiscard]] bool existed() const { return existed_.load(std::memory_order_relaxed); }
+    void setExisted(bool existed) { existed_.store(existed, std::memory_order_relaxed); }
+    /// False from its creation until the move into its class directory has been synced; then true for ever. Changed
+    /// without the identifier locks.
     [[nodiscard]] bool durable() const { return durable_.load(std::memory_order_acquire); }
     void setDurable(bool durable) { durable_.store(durable, std::memory_order_release); }
 
@@ -87,16 +88,18 @@ private:
     std::uint32_t uid_;
     std::uint8_t containerClass_;
     bool transient_ = false;
-    bool existed_ = false;
+    std::atomic<bool> existed_{false};
     std::atomic<bool> durable_{true};
 };
 
 enum class CheckClassPath { no, yes };
 
-/// Reads and judges the metadata of the container at `url` for a user; errors 12 and 29, logged. Changes nothing.
+/// Reads and judges the metadata of the container at `url` for a user; errors 12 and 29, logged. Changes nothing. A
+/// file of `formerOwner` is believed as well.
 Result<std::shared_ptr<ZORMetadata>> readAndValidateMetadataAtUrl(const Log& log, ZORFileManager& fileManager,
                                                                   const FileURL& url, std::uint32_t userId,
-                                                                  CheckClassPath checkClassPath);
+                                                                  CheckClassPath checkClassPath,
+                                                                  std::optional<uid_t> formerOwner = std::nullopt);
 
 /// Reads many containers of one directory: the directory is open, and nothing about it is worked out twice.
 /// Errors are made without a log line, so that threads may share the work and one of them can say the errors in order.
@@ -104,7 +107,7 @@ class MetadataReader {
 public:
     /// `directory` is open and stays so; `parentPath` is its path.
     MetadataReader(int directory, std::shared_ptr<const std::string> parentPath, std::uint32_t userId,
-                   CheckClassPath checkClassPath);
+                   CheckClassPath checkClassPath, std::optional<uid_t> formerOwner = std::nullopt);
     /// The container `name` in the directory. Any thread.
     [[nodiscard]] Result<std::shared_ptr<ZORMetadata>> read(const char* name) const;
 
@@ -113,6 +116,7 @@ private:
     const std::shared_ptr<const std::string> parentPath_;
     const std::uint32_t userId_;
     const CheckClassPath checkClassPath_;
+    const std::optional<uid_t> formerOwner_;
 };
 
 /// The judgement alone, on the bytes of a file: what a fuzzer calls.

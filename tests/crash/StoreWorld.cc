@@ -29,6 +29,7 @@ platform::Platform withRoles(platform::LinuxPlatform& linuxPlatform, platform::D
             .lockState = real.lockState,
             .protection = protection,
             .sandbox = sandbox,
+            .assertions = real.assertions,
             .crash = real.crash,
             .bootMarker = marker,
             .transactions = real.transactions,

@@ -98,11 +98,7 @@ TEST_F(Dispatch, EveryCommandAdmitsByItsEntitlement) {
                                   (command == 11 && row.admits == Admits::basicAndWipe);
             const Dictionary message{{"Command", command}};
             if (admitted) {
-                const Dictionary reply = request(message);
-                EXPECT_NE(errorOf(reply), 0U);
-                if (commandTable[command].handler == commands::notServedYet) {
-                    EXPECT_NE(errorOf(reply), ipc::replySuccess);
-                }
+                EXPECT_NE(errorOf(request(message)), 0U);
             } else {
                 const auto channel = std::make_shared<FakeReply>();
                 handle({.kind = Kind::message, .request = message, .reply = channel});

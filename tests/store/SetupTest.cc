@@ -119,7 +119,8 @@ TEST(Setup, AnInternalBuildShowsWhatItDeletes) {
 TEST(Setup, BootAndLaunch) {
     World world;
     const std::string identifier = "com.example";
-    const plist::Dictionary groups{{std::string(entitlementKeys::applicationGroups), plist::Array{identifier}}};
+    const plist::Dictionary groups{{std::string(entitlementKeys::applicationGroups), plist::Array{identifier}},
+                                   {std::string(entitlementKeys::systemContainer), true}};
     ASSERT_EQ(world.services().entitlements().processEntitlements(&groups, &identifier, nullptr), ErrorCode::success);
     const auto make = [&](std::uint32_t userId, ContainerClass containerClass, bool transient) {
         return world.daemonsClient()
@@ -182,6 +183,8 @@ TEST(Setup, GoesOnAfterFailures) {
     for (const std::string& message : world.log.take(3, "rebootContainerManagerSetup"))
         starts.push_back(message.substr(0, message.find(" : ")));
     EXPECT_EQ(starts, (std::vector<std::string>{
+                          "Failed to migrate bundle containers to system location",
+                          "Failed to migrate whitelisted bundle containers",
                           "Failed to delete shared transient URL " + world.path(cachesPath) + "/Temp",
                           "Failed to delete shared transient bundle URL " +
                               world.path("private/var/brevad/Library/Caches/com.veltra.zorvaned"),

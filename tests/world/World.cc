@@ -33,8 +33,9 @@ platform::Platform withRoles(const platform::Platform& real, World& world) {
             .systemVersion = real.systemVersion,
             .passwords = real.passwords,
             .lockState = world.lockState,
-            .protection = real.protection,
+            .protection = world.protection(),
             .sandbox = world.sandbox,
+            .assertions = real.assertions,
             .crash = real.crash,
             .bootMarker = world.bootMarker,
             .transactions = real.transactions,
@@ -93,12 +94,14 @@ void World::start() {
     platform_ = std::move(*opened);
     lockStateQueue.inner = &platform_->roles().lockStateQueue;
     sandbox.inner = &platform_->roles().sandbox;
+    protection_ = std::make_unique<platform::XattrProtectionClass>(platform_->root(), faults_, lockState);
     composition_ = std::make_unique<Composition>(withRoles(platform_->roles(), *this), options_.probe);
 }
 
 void World::restart() {
     platform_->finish();
     composition_.reset();
+    protection_.reset();
     platform_.reset();
     start();
 }

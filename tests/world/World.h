@@ -147,6 +147,8 @@ public:
     CountingQueue lockStateQueue;
     FailingSandbox sandbox;
     support::FaultDisk& disk() { return faults_; }
+    /// Classes under the lock state in the test's hand.
+    platform::XattrProtectionClass& protection() { return *protection_; }
 
 private:
     void start();
@@ -156,6 +158,7 @@ private:
     platform::LinuxDisk realDisk_;
     support::FaultDisk faults_{realDisk_};
     std::unique_ptr<platform::LinuxPlatform> platform_;
+    std::unique_ptr<platform::XattrProtectionClass> protection_;
     std::unique_ptr<Composition> composition_;
 };
 

@@ -45,6 +45,8 @@ enum class ErrorCode : std::uint64_t {
     usersDiffer = 56,
     entitlementFileNotWritten = 59,
     entitlementCountsDiffer = 60,
+    lockedAndNotRetried = 61,
+    ownerNotChanged = 62,
 };
 
 } // namespace zor

@@ -6,8 +6,7 @@
 namespace zor {
 
 std::string ZORError::text() const {
-    return formatted("%s %d \"%s\"", domain_ == ErrorDomain::zor ? "ZORErrorDomain" : "POSIX", code_,
-                     ZOR_SHOWN(description_));
+    return formatted("%s %d \"%s\"", domainName(), code_, ZOR_SHOWN(description_));
 }
 
 void logError(const Log& log, const ZORError& error) {

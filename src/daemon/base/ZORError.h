@@ -28,6 +28,7 @@ public:
           description_(std::move(description)), underlying_(std::move(underlying)) {}
 
     [[nodiscard]] ErrorDomain domain() const { return domain_; }
+    [[nodiscard]] const char* domainName() const { return domain_ == ErrorDomain::zor ? "ZORErrorDomain" : "POSIX"; }
     [[nodiscard]] int code() const { return code_; }
     [[nodiscard]] const std::optional<std::string>& description() const { return description_; }
     [[nodiscard]] const ZORError* underlying() const { return underlying_.get(); }

@@ -38,8 +38,7 @@ void wipeDataContainerContent(CommandContext& context);
 void getDiskUsage(CommandContext& context);
 void retryTest(CommandContext& context);
 
-// NotServedYet.cc: a command of the table that this version refuses, with an error and a line that says so. It replies
-// itself.
-void notServedYet(CommandContext& context);
+// ProtectionCommands.cc
+void setDataProtection(CommandContext& context);
 
 } // namespace zor::commands

@@ -81,6 +81,7 @@ Platform LinuxPlatform::roles() {
             .lockState = lockState_,
             .protection = protection_,
             .sandbox = sandbox_,
+            .assertions = assertions_,
             .crash = crash_,
             .bootMarker = bootMarker_,
             .transactions = transactions_,

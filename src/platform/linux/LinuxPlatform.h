@@ -11,6 +11,7 @@
 #include "platform/linux/EpollRunLoop.h"
 #include "platform/linux/FileCrashAnnotation.h"
 #include "platform/linux/FileDeviceLockState.h"
+#include "platform/linux/FileTerminationAssertionService.h"
 #include "platform/linux/IdentityRegistry.h"
 #include "platform/linux/LinkSandboxUserState.h"
 #include "platform/linux/LinuxDisk.h"
@@ -78,6 +79,7 @@ private:
     FileDeviceLockState lockState_{root_};
     XattrProtectionClass protection_{root_, disk_, lockState_};
     LinkSandboxUserState sandbox_{root_, disk_};
+    FileTerminationAssertionService assertions_{root_, disk_};
     FileCrashAnnotation crash_{root_, disk_};
     SemaphoreBootMarker bootMarker_{root_};
     ServiceTransactions transactions_;

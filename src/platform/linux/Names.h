@@ -25,9 +25,9 @@ inline constexpr const char* serviceSocket = ipc::serviceName.data();
 inline constexpr const char* upcallSocket = ipc::upcallServiceName.data();
 inline constexpr const char* statusSocket = ipc::statusSocketName.data();
 inline constexpr const char* lockFile = "zorvaned.lock";
-inline constexpr const char* lockState = "lockstate";
+inline constexpr const char* lockState = ipc::lockStateFile.data();
 inline constexpr const char* sandboxDirectory = "sandbox";
-inline constexpr const char* assertionDirectory = "assertions";
+inline constexpr const char* assertionDirectory = ipc::assertionDirectory.data();
 
 // The log directory, which the store makes, and its files.
 inline constexpr const char* logDirectory = "private/var/root/Library/Logs/Zorvane";

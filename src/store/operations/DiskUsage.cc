@@ -6,6 +6,7 @@
 // long as it is walked. The container is looked up and opened under its lock, and walked on that descriptor; the result
 // is kept only if the lock, taken again, finds the same container at the same place.
 #include "daemon/ZORClientConnection.h"
+#include "ipc/Keys.h"
 #include "platform/BlockingScope.h"
 #include "store/StoreServices.h"
 
@@ -17,7 +18,7 @@ namespace zor {
 namespace {
 
 constexpr const char* function = "diskUsageForUserId";
-const std::string staticDiskUsageKey = "com.veltra.Brevance.StaticDiskUsage";
+const std::string staticDiskUsageKey(ipc::infoKeys::staticDiskUsage);
 
 } // namespace
 

@@ -6,12 +6,15 @@
 // stop anywhere is mended by the next launch: the boot's work is marked as done only when all of it ran.
 #include "daemon/ZORClientConnection.h"
 #include "daemon/base/UserIdentity.h"
+#include "entitlements/ZOREntitlementMapping.h"
 #include "entitlements/ZORGroupManager.h"
 #include "entitlements/ZORWhitelist.h"
+#include "migration/ZORContainerMigrator.h"
 #include "store/Names.h"
 #include "store/StoreServices.h"
 #include "store/operations/ReplaceJournal.h"
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 
@@ -23,6 +26,8 @@ constexpr std::array orphanReportHead = {
     "***INTERNAL BUILD REQUEST: If you see this, file a Tracklet in \"Zorvane | all\" with the following data:",
     "\tSomeone is writing invalid data to a container, which has now been orphaned. Here are the invalid files:",
 };
+constexpr const char* launchFunction = "containerManagerSetup";
+constexpr const char* rebootFunction = "rebootContainerManagerSetup";
 constexpr const char* orphanReportEnd = "***END INTERNAL BUILD REQUEST";
 
 template <typename Function>
@@ -43,28 +48,69 @@ bool isUserClass(ContainerClass containerClass) {
 } // namespace
 
 void ZORClientConnection::rebootContainerManagerSetup() {
-    const auto discard = [this](const std::optional<FileURL>& url, const char* what) {
-        const auto moved = url ? _moveItemAtURLToDeathRow(*url, StartDeletionThread::no) : Result<void>();
-        if (!moved)
-            services_.log.write(logLevelError, "rebootContainerManagerSetup", "Failed to delete %s URL %s : %s", what,
-                                url->c_str(), moved.error().text().c_str());
-    };
-    discard(services_.configuration.transientDirectory(), "shared transient");
-    discard(services_.configuration.transientBundleDirectory(), "shared transient bundle");
-    services_.groups.reconcileGroupContainersOfType(GroupType::system);
-    services_.groups.reconcileGroupContainersOfType(GroupType::application);
+    SetupReport& report = services_.setup;
+    report.run("bundle migration", [this] { return migrateBundles(); });
+    report.run("well-known migration", [this] { return migrateWellknown(); });
+    report.run("shared transient containers", [this] {
+        return discardAtBoot(services_.configuration.transientDirectory(), "shared transient") +
+               discardAtBoot(services_.configuration.transientBundleDirectory(), "shared transient bundle");
+    });
+    report.run("group identifiers of data containers",
+               [this] { return services_.entitlements.migrateAppGroupIdsFromDataContainersToFile(); });
+    report.run("system containers", [this] { return services_.entitlements.reconcileSystemContainers(); });
+    report.run("system groups", [this] { return services_.groups.reconcileGroupContainersOfType(GroupType::system); });
+    report.run("application groups",
+               [this] { return services_.groups.reconcileGroupContainersOfType(GroupType::application); });
+    report.run("orphans of users", [this] { return cleanUpUsers(); });
+    report.run("orphans of the system", [this] {
+        std::uint64_t removed = 0;
+        forEachClass(isSharedClass, [&](ContainerClass containerClass) {
+            removed += _cleanupOrphanedDataForUser(
+                isBundleClass(containerClass) ? bundleOwnerUserId : systemOwnerUserId, containerClass);
+        });
+        return removed;
+    });
+}
+
+std::uint64_t ZORClientConnection::migrateBundles() {
+    const auto outcome = services_.migrator.performMigrationWithError();
+    if (!outcome.succeeded)
+        services_.log.write(logLevelError, rebootFunction,
+                            "Failed to migrate bundle containers to system location : %s",
+                            outcome.error ? outcome.error->text().c_str() : "(null)");
+    return outcome.migrated;
+}
+
+std::uint64_t ZORClientConnection::migrateWellknown() {
+    const auto outcome = services_.migrator.performWhitelistMigrationWithError();
+    if (!outcome.succeeded)
+        services_.log.write(logLevelError, rebootFunction, "Failed to migrate whitelisted bundle containers : %s",
+                            outcome.error ? outcome.error->text().c_str() : "(null)");
+    return outcome.migrated;
+}
+
+std::uint64_t ZORClientConnection::discardAtBoot(const std::optional<FileURL>& url, const char* what) {
+    if (!url)
+        return 0;
+    const auto moved = _moveItemAtURLToDeathRow(*url, StartDeletionThread::no);
+    if (!moved)
+        services_.log.write(logLevelError, rebootFunction, "Failed to delete %s URL %s : %s", what, url->c_str(),
+                            moved.error().text().c_str());
+    return moved ? 1 : 0;
+}
+
+std::uint64_t ZORClientConnection::cleanUpUsers() {
+    std::uint64_t removed = 0;
     for (std::uint32_t userId = firstMobileUserId; userId <= lastMobileUserId; ++userId) {
         ZORPerUserConfiguration* user = services_.configuration.getPerUserConfigurationForUserId(userId);
         if (!user || !user->existsUserBaseDirectory())
             continue;
-        discard(user->transientDirectory(), "per-user transient");
-        forEachClass(isUserClass,
-                     [&](ContainerClass containerClass) { _cleanupOrphanedDataForUser(userId, containerClass); });
+        removed += discardAtBoot(user->transientDirectory(), "per-user transient");
+        forEachClass(isUserClass, [&](ContainerClass containerClass) {
+            removed += _cleanupOrphanedDataForUser(userId, containerClass);
+        });
     }
-    forEachClass(isSharedClass, [&](ContainerClass containerClass) {
-        _cleanupOrphanedDataForUser(isBundleClass(containerClass) ? bundleOwnerUserId : systemOwnerUserId,
-                                    containerClass);
-    });
+    return removed;
 }
 
 bool ZORClientConnection::isOrphan(const FileURL& entry, ContainerClass containerClass) {
@@ -90,45 +136,49 @@ void ZORClientConnection::reportOrphan(const FileURL& entry) {
     services_.log.write(logLevelError, function, "%s", orphanReportEnd);
 }
 
-void ZORClientConnection::_cleanupOrphanedDataForUser(std::uint32_t userId, ContainerClass containerClass) {
+std::uint64_t ZORClientConnection::_cleanupOrphanedDataForUser(std::uint32_t userId, ContainerClass containerClass) {
     const auto directory = services_.configuration.containerDirectoryURLForUser(userId, containerClass, false);
     if (!directory)
-        return;
+        return 0;
     const auto entries = services_.fileManager.urlsForItemsInDirectoryAtURL(*directory);
     if (!entries) {
         if (!entries.error().isPosix(ENOENT))
             services_.log.write(logLevelError, __func__, "Failed to get items at %s : %s", directory->c_str(),
                                 entries.error().text().c_str());
-        return;
+        return 0;
     }
+    std::uint64_t removed = 0;
     for (const FileURL& entry : *entries) {
         if (!isOrphan(entry, containerClass))
             continue;
         if (services_.internalBuild.isInternalBuild())
             reportOrphan(entry);
         // A failure has been logged where it happened; the next boot tries again.
-        (void)_moveItemAtURLToDeathRow(entry, StartDeletionThread::no);
+        removed += _moveItemAtURLToDeathRow(entry, StartDeletionThread::no) ? 1 : 0;
     }
     // Copies across file systems that a stop cut short: hidden, so no listing shows them.
     for (const FileURL& leftover : services_.fileManager.copyLeftoversInDirectoryAtURL(*directory))
         (void)_moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
+    return removed;
 }
 
-void ZORClientConnection::sweepStaging() {
+std::uint64_t ZORClientConnection::sweepStaging() {
     const FileURL staging = services_.configuration.stagingDirectory();
     const auto entries = services_.fileManager.urlsForItemsInDirectoryAtURL(staging);
     if (!entries) {
         if (!entries.error().isPosix(ENOENT))
-            services_.log.write(logLevelError, "containerManagerSetup", "Failed to get items at staging URL%s : %s",
+            services_.log.write(logLevelError, launchFunction, "Failed to get items at staging URL%s : %s",
                                 staging.c_str(), entries.error().text().c_str());
-        return;
+        return 0;
     }
     const auto kept = stagedByJournals();
+    std::uint64_t swept = 0;
     for (const FileURL& entry : *entries)
         if (!kept.contains(entry.lastPathComponent()))
-            (void)_moveItemAtURLToDeathRow(entry, StartDeletionThread::no);
+            swept += _moveItemAtURLToDeathRow(entry, StartDeletionThread::no) ? 1 : 0;
     for (const FileURL& leftover : services_.fileManager.copyLeftoversInDirectoryAtURL(staging))
         (void)_moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
+    return swept;
 }
 
 std::set<std::string, std::less<>> ZORClientConnection::stagedByJournals() {
@@ -144,23 +194,38 @@ std::set<std::string, std::less<>> ZORClientConnection::stagedByJournals() {
     return names;
 }
 
+std::size_t ZORClientConnection::journalCount() {
+    const auto items = services_.fileManager.urlsForItemsInDirectoryAtURL(services_.configuration.replaceDirectory());
+    return items ? items->size() : 0;
+}
+
 void ZORClientConnection::makeDirectoriesDurable() {
     const FileURL library = services_.configuration.libraryDirectory();
     const auto directory = services_.fileManager.resolver().openDirectory(library);
     const int status = directory ? services_.durability.afterMove(directory->get()) : -directory.error();
     if (status < 0)
-        services_.log.write(logLevelError, "containerManagerSetup", "sync of %s failed: %s", library.c_str(),
+        services_.log.write(logLevelError, launchFunction, "sync of %s failed: %s", library.c_str(),
                             errorText(-status));
 }
 
 void ZORClientConnection::containerManagerSetup() {
-    if (!_recoverFromReplaceOperationsWithError())
-        services_.log.write(logLevelError, __func__, "Failed recovering from replace operations");
-    sweepStaging();
+    SetupReport& report = services_.setup;
+    report.run("replace recovery", [this] {
+        const std::size_t journals = journalCount();
+        if (!_recoverFromReplaceOperationsWithError())
+            services_.log.write(logLevelError, launchFunction, "Failed recovering from replace operations");
+        return static_cast<std::uint64_t>(journals - std::min(journals, journalCount()));
+    });
+    report.run("staging sweep", [this] { return sweepStaging(); });
     deleteContainersOnDeathRowWithCompletion(nullptr);
     // A stop between the move of a container and its mapping leaves a mapping that points to nothing.
-    if (const unsigned removed = services_.sandbox.removeDanglingMappings())
-        services_.log.write(logLevelNotice, __func__, "Removed %u sandbox mappings whose container is gone", removed);
+    report.run("dangling mappings", [this] {
+        const unsigned removed = services_.sandbox.removeDanglingMappings();
+        if (removed != 0)
+            services_.log.write(logLevelNotice, launchFunction, "Removed %u sandbox mappings whose container is gone",
+                                removed);
+        return std::uint64_t{removed};
+    });
     // Files that are acknowledged one by one later lie in directories that must not go with the power.
     makeDirectoriesDurable();
     // What the boot's passes read is older than what they cleaned up afterwards.

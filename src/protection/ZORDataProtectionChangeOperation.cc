@@ -1,0 +1,224 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "protection/ZORDataProtectionChangeOperation.h"
+
+#include "platform/BlockingScope.h"
+#include "store/StoreServices.h"
+
+#include <cerrno>
+#include <chrono>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <thread>
+
+namespace zor {
+
+using fs::WalkEntry;
+using fs::WalkEntryKind;
+using fs::WalkStep;
+
+namespace {
+
+constexpr const char* performFunction = "performChangeOperation";
+constexpr const char* passFunction = "_runChangeOperationNeedToRetry";
+
+/// Never given, and never taken away either.
+constexpr int untouchableClass = 2;
+/// Files get this in place of class 0, which only directories can have.
+constexpr int classOfFilesForNone = 3;
+/// A retry that finds the device locked came before the queue was suspended: it need not come again at once.
+constexpr std::chrono::milliseconds retryInterval{20};
+
+unsigned long long number(ContainerClass containerClass) {
+    return static_cast<unsigned long long>(containerClass);
+}
+
+} // namespace
+
+void ZORDataProtectionChangeOperation::performChangeOperation() {
+    const ZORMetadata& container = *dataContainerMetadata_;
+    const auto pass = services_.boundary.run({performFunction, __LINE__}, [&]() -> Result<NeedRetry> {
+        const platform::BlockingScope blocking; // a large tree must not take one of the few threads from all clients
+        return _runChangeOperationNeedToRetry();
+    });
+    const bool locked = pass && *pass == NeedRetry::yes;
+    std::optional<ZORError> error;
+    if (!pass) {
+        error = pass.error();
+        services_.log.write(logLevelNotice, performFunction,
+                            "Operation to update protection classes for user: %u, id: %s, containerClass: %llu to "
+                            "class %d failed with error %s",
+                            container.uid(), ZOR_SHOWN(container.identifier()), number(container.containerClass()),
+                            newDataProtectionClass_, error->text().c_str());
+    }
+    if (locked && retryIfLocked_ == RetryIfLocked::yes) {
+        queueRetry();
+        return;
+    }
+    if (locked)
+        error =
+            makeError(services_.log, {performFunction, __LINE__}, ErrorCode::lockedAndNotRetried, nullptr, LogFlag::yes,
+                      "Tried to update user: %u, id: %s, containerClass: %llu to protection class %d, but was "
+                      "locked and didn't retry",
+                      container.uid(), ZOR_SHOWN(container.identifier()), number(container.containerClass()),
+                      newDataProtectionClass_);
+    if (completionBlock_)
+        completionBlock_(locked, error);
+}
+
+void ZORDataProtectionChangeOperation::queueRetry() {
+    const ZORMetadata& container = *dataContainerMetadata_;
+    services_.log.write(
+        logLevelNotice, performFunction,
+        "Retrying container protection update to %d on next unlock for user: %u, id: %s, containerClass: %llu",
+        newDataProtectionClass_, container.uid(), ZOR_SHOWN(container.identifier()),
+        number(container.containerClass()));
+    ZORDispatchAsyncWithTransaction(services_.transactions, services_.lockStateQueue,
+                                    [self = shared_from_this()] { self->retry(); });
+}
+
+void ZORDataProtectionChangeOperation::retry() {
+    if (!retried_ && retryStartBlock_)
+        retryStartBlock_();
+    if (std::exchange(retried_, true))
+        std::this_thread::sleep_for(retryInterval);
+    performChangeOperation();
+}
+
+Result<ZORDataProtectionChangeOperation::NeedRetry> ZORDataProtectionChangeOperation::_runChangeOperationNeedToRetry() {
+    std::vector<Item> items;
+    platform::FileDescriptor container;
+    {
+        const AllIdentifiersLock lock(services_.locks, LockMode::reading);
+        TRY(checkStillThere());
+        items = existingItems();
+        if (items.empty())
+            return NeedRetry::no;
+        container = TRY(openContainer());
+    }
+    const auto walked = walk(container.get(), items);
+    if (!walked && walked.error().isPosix(EPERM))
+        return NeedRetry::yes;
+    TRY(walked);
+    const AllIdentifiersLock lock(services_.locks, LockMode::reading);
+    TRY(checkStillThere());
+    return NeedRetry::no;
+}
+
+Result<void> ZORDataProtectionChangeOperation::checkStillThere() {
+    const ZORMetadata& container = *dataContainerMetadata_;
+    const auto found = services_.sharedClientConnection->createOrLookupContainerForUser(
+        container.uid(), &container.identifier(), container.containerClass(),
+        {.createIfNecessary = false, .transient = false, .useLocking = UseLocking::no});
+    if (!found)
+        return makeError(services_.log, {passFunction, __LINE__}, ErrorCode::notFound, &found.error(), LogFlag::yes,
+                         "Failed to lookup container to set data protection for userId: %u, identifier: %s, Class: "
+                         "%llu",
+                         container.uid(), ZOR_SHOWN(container.identifier()), number(container.containerClass()));
+    if (found->path != container.url().path())
+        return makeError(services_.log, {passFunction, __LINE__}, ErrorCode::pathNotAsExpected, nullptr, LogFlag::yes,
+                         "Cancelling data protection operation because container path changed on disk. This indicates "
+                         "the app may have been updated and changed its protection level.");
+    return {};
+}
+
+std::vector<ZORDataProtectionChangeOperation::Item> ZORDataProtectionChangeOperation::existingItems() {
+    std::vector<Item> items;
+    for (const std::string_view name : ZORGlobalConfiguration::appUserDataItemNames()) {
+        const FileURL url = dataContainerMetadata_->url().appendingDirectory(name);
+        if (services_.fileManager.itemExistsAtURL(url))
+            items.push_back({.name = std::string(name), .path = url.path()});
+    }
+    return items;
+}
+
+Result<platform::FileDescriptor> ZORDataProtectionChangeOperation::openContainer() {
+    const FileURL url = dataContainerMetadata_->url();
+    auto opened = services_.fileManager.resolver().openDirectory(url);
+    if (!opened)
+        return posixError({passFunction, __LINE__}, opened.error(), "fts_open failed for %s : %s", url.c_str(),
+                          errorText(opened.error()));
+    return std::move(*opened);
+}
+
+Result<void> ZORDataProtectionChangeOperation::walk(int container, const std::vector<Item>& items) {
+    namesMet_.clear();
+    std::optional<ZORError> failure;
+    for (const Item& item : items) {
+        fs::TreeWalker walker;
+        const int status = walker.walk(container, item.name.c_str(), [&](const WalkEntry& entry) {
+            if (auto visited = visit(entry, item); !visited) {
+                failure = std::move(visited).error();
+                return WalkStep::stop;
+            }
+            return WalkStep::proceed;
+        });
+        if (failure)
+            return *failure;
+        if (status < 0)
+            services_.log.write(logLevelError, passFunction, "FTS returned error for %s : %s", item.path.c_str(),
+                                errorText(-status));
+    }
+    return {};
+}
+
+Result<void> ZORDataProtectionChangeOperation::visit(const WalkEntry& entry, const Item& item) {
+    if (entry.onOtherFileSystem)
+        return {};
+    const auto path = [&] { return entry.depth == 0 ? item.path : item.path + '/' + entry.path(); };
+    switch (entry.kind) {
+    case WalkEntryKind::directory:
+    case WalkEntryKind::symbolicLink:
+    case WalkEntryKind::other:
+        return {};
+    case WalkEntryKind::directoryEnd:
+        return (operationType_ & protectionChange::directories) != 0 ? changeDirectory(entry, path()) : Result<void>();
+    case WalkEntryKind::file:
+        return (operationType_ & protectionChange::files) != 0 ? changeFile(entry, path()) : Result<void>();
+    case WalkEntryKind::unreadableDirectory:
+    case WalkEntryKind::noStatus:
+        break;
+    }
+    services_.log.write(logLevelError, passFunction, "FTS returned error for %s : %s", ZOR_SHOWN(path()),
+                        errorText(entry.error));
+    return {};
+}
+
+Result<void> ZORDataProtectionChangeOperation::changeDirectory(const WalkEntry& entry, const std::string& path) {
+    return setClass(entry, path, newDataProtectionClass_, [](int current) { return current == untouchableClass; });
+}
+
+Result<void> ZORDataProtectionChangeOperation::changeFile(const WalkEntry& entry, const std::string& path) {
+    // A file with a name elsewhere may be somebody else's too.
+    if (entry.status.st_nlink > 1 && !allNamesMet(entry.status))
+        return {};
+    const std::int32_t target = newDataProtectionClass_ == 0 ? classOfFilesForNone : newDataProtectionClass_;
+    const bool keepLower = (operationType_ & protectionChange::keepLower) != 0;
+    return setClass(entry, path, target, [target, keepLower](int current) {
+        return current == target || current == untouchableClass || (keepLower && target > current);
+    });
+}
+
+Result<void> ZORDataProtectionChangeOperation::setClass(const WalkEntry& entry, const std::string& path,
+                                                        std::int32_t target, const std::function<bool(int)>& declines) {
+    auto set = services_.fileManager.setDataProtectionClassOfEntry(entry, path, target, [&](int current) {
+        if (declines(current))
+            return false;
+        if (services_.log.writes(logLevelDebug))
+            services_.log.write(logLevelDebug, passFunction, "Setting protection class of %s to %d", ZOR_SHOWN(path),
+                                target);
+        return true;
+    });
+    if (set || !set.error().isPosix(EBADF))
+        return set;
+    services_.log.write(logLevelError, passFunction,
+                        "Ignoring failure to set protection class to %d on %s (mode 0%o): %s", target, ZOR_SHOWN(path),
+                        entry.status.st_mode, set.error().text().c_str());
+    return {};
+}
+
+bool ZORDataProtectionChangeOperation::allNamesMet(const struct stat& status) {
+    const auto met = namesMet_.try_emplace(status.st_ino, 0).first;
+    return ++met->second >= status.st_nlink;
+}
+
+} // namespace zor

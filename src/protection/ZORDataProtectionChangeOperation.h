@@ -1,0 +1,99 @@
+// SPDX-License-Identifier: Apache-2.0
+// One change of the data-protection class of what a user keeps in a container: a pass over its files, again after each
+// unlock for as long as a lock gets in the way.
+//
+// The tree belongs to a client, who may change it during the walk. Classes are set on descriptors of what the walk met,
+// never by a name; nothing outside the container is touched, and a file that has names outside is left as it is.
+//
+// A pass holds a lock while it looks the container up and opens it, and again afterwards to see that it is still the
+// same container at the same place; not in between, since every lookup of any client waits for such locks. The lookup
+// goes by identifier and may come upon another container's record: so the lock is the all-identifiers lock, for
+// reading, which keeps out all that the container's own lock would.
+//
+// A stop in the middle leaves some files changed and nothing recorded; the same request, sent again, does the rest.
+//
+// Held by shared_ptr: a retry that waits on the lock-state queue keeps it. It runs on one thread at a time.
+#pragma once
+
+#include "daemon/ZORClientConnection.h"
+#include "fs/TreeWalker.h"
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <unordered_map>
+#include <vector>
+
+namespace zor {
+
+/// What a change does, as bits.
+namespace protectionChange {
+inline constexpr std::int32_t directories = 1;
+inline constexpr std::int32_t files = 2;
+/// Leave a file alone when the number of its class is lower than the new one.
+inline constexpr std::int32_t keepLower = 4;
+} // namespace protectionChange
+
+class ZORDataProtectionChangeOperation : public std::enable_shared_from_this<ZORDataProtectionChangeOperation> {
+public:
+    enum class RetryIfLocked : bool { no, yes };
+    /// `wasLocked`: a pass met a locked device, and no retry was wanted.
+    using CompletionBlock = std::function<void(bool wasLocked, const std::optional<ZORError>& error)>;
+
+    /// initWithContainerMetadata:newClass:retryingIfLocked:changeType:. The record is the operation's own: as the
+    /// container was when the change was asked for.
+    ZORDataProtectionChangeOperation(StoreServices& services, std::shared_ptr<const ZORMetadata> dataContainerMetadata,
+                                     std::int32_t newDataProtectionClass, RetryIfLocked retryIfLocked,
+                                     std::int32_t operationType)
+        : services_(services), dataContainerMetadata_(std::move(dataContainerMetadata)),
+          newDataProtectionClass_(newDataProtectionClass), retryIfLocked_(retryIfLocked),
+          operationType_(operationType) {}
+    ZORDataProtectionChangeOperation(const ZORDataProtectionChangeOperation&) = delete;
+    ZORDataProtectionChangeOperation& operator=(const ZORDataProtectionChangeOperation&) = delete;
+
+    /// Runs once, before the first retry.
+    void setRetryStartBlock(std::function<void()> block) { retryStartBlock_ = std::move(block); }
+    /// Runs once, when the operation ends.
+    void setCompletionBlock(CompletionBlock block) { completionBlock_ = std::move(block); }
+
+    /// One pass; then the completion, or a retry on the lock-state queue.
+    void performChangeOperation();
+
+private:
+    enum class NeedRetry : bool { no, yes };
+    Result<NeedRetry> _runChangeOperationNeedToRetry();
+    void queueRetry();
+    void retry();
+
+    /// The open container, as it was when the change was asked for; errors 21, 10, or the system's.
+    Result<platform::FileDescriptor> openContainer();
+    /// Errors 21, 10.
+    Result<void> checkStillThere();
+    struct Item {
+        std::string name;
+        std::string path;
+    };
+    std::vector<Item> existingItems();
+    Result<void> walk(int container, const std::vector<Item>& items);
+    Result<void> visit(const fs::WalkEntry& entry, const Item& item);
+    Result<void> changeDirectory(const fs::WalkEntry& entry, const std::string& path);
+    Result<void> changeFile(const fs::WalkEntry& entry, const std::string& path);
+    Result<void> setClass(const fs::WalkEntry& entry, const std::string& path, std::int32_t target,
+                          const std::function<bool(int)>& declines);
+    [[nodiscard]] bool allNamesMet(const struct stat& status);
+
+    StoreServices& services_;
+    const std::shared_ptr<const ZORMetadata> dataContainerMetadata_;
+    const std::int32_t newDataProtectionClass_;
+    const RetryIfLocked retryIfLocked_;
+    const std::int32_t operationType_;
+    bool retried_ = false;
+    std::function<void()> retryStartBlock_;
+    CompletionBlock completionBlock_;
+    /// Of one pass: how many names were met of each file that has several.
+    std::unordered_map<ino_t, nlink_t> namesMet_;
+};
+
+} // namespace zor
