@@ -179,6 +179,10 @@ std::string uuidText(const std::array<std::uint8_t, 16>& uuid) {
     return ipc::uuidText(uuid);
 }
 
+std::string_view protectionClassInfoKey() {
+    return ipc::infoKeys::contentProtectionClass;
+}
+
 Client::Client(std::unique_ptr<Connection> connection) : connection_(std::move(connection)) {}
 Client::Client(Client&&) noexcept = default;
 Client& Client::operator=(Client&&) noexcept = default;
@@ -330,6 +334,17 @@ Result<void> Client::recreateDefaultStructure(const Address& address) {
 
 Result<void> Client::regenerateDirectoryUUID(const Address& address) {
     return withoutContent(connection_->call(addressed(ipc::Command::regenerateDirectoryUUID, address)));
+}
+
+Result<void> Client::setDataProtection(const ProtectionChange& change) {
+    plist::Dictionary message = request(ipc::Command::setDataProtection);
+    message.set(keys::containerClass, change.containerClass);
+    message.set(keys::userId, change.user);
+    message.set(keys::identifier, change.identifier);
+    message.set(keys::dataProtectionClass, change.protectionClass);
+    message.set(keys::isThirdParty, change.thirdParty);
+    message.set(keys::retryIfLocked, change.retryIfLocked);
+    return withoutContent(connection_->call(message));
 }
 
 Result<std::uint64_t> Client::diskUsage(const Address& address) {

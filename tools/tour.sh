@@ -115,6 +115,59 @@ sandboxes() {
     [[ -z "$(find "$root" -name basket.txt)" ]] || fail "the basket is still somewhere"
 }
 
+# Measuring, replacing and wiping a container that has something in it.
+lifecycle() {
+    say "Measured, with a note attached to it; then replaced as a whole, and wiped."
+    ctl usage --class data-app --user 501
+    ctl info set org.example.notes favourite '"bread"' --class data-app --user 501
+    ctl create org.example.notes --class data-app --user 501 --transient
+    echo "rye bread" >"$(pathInAnswer)/Documents/shopping.txt"
+    ctl replace org.example.notes --class data-app --user 501 --yes
+    ctl lookup org.example.notes --class data-app --user 501
+    notes="$(pathInAnswer)"
+    [[ "$(cat "$notes/Documents/shopping.txt")" == "rye bread" ]] || fail "the new content is not there"
+    ctl wipe org.example.notes --class data-app --user 501 --yes
+    [[ -d "$notes/Documents" && ! -e "$notes/Documents/shopping.txt" ]] || fail "the container was not wiped"
+}
+
+# A stricter class for files of an application, asked for while the device is locked.
+protection() {
+    local answered="$root/tmp/answered"
+    say "The device is locked, and an installer asks for a stricter data-protection class: no answer yet."
+    echo "secret" >"$notes/Documents/secret.txt"
+    ctl lock-state 1
+    echo '$ zorvanectl protect org.example.notes 1 --class data-app --user 501 &'
+    "$binaries/zorvanectl" --root "$root" protect org.example.notes 1 --class data-app --user 501 >"$answered" &
+    local asking=$!
+    for ((try = 0; try < 100; ++try)); do
+        ctl protection org.example.notes --class data-app --user 501 >/dev/null
+        [[ "$answer" == *pending* ]] && break
+        sleep 0.05
+    done
+    ctl protection org.example.notes --class data-app --user 501
+    [[ "$answer" == *pending* && ! -s "$answered" ]] || fail "the change does not wait"
+    say "It is unlocked, and there is the answer."
+    ctl lock-state 0
+    wait "$asking" || fail "the change failed"
+    cat "$answered"
+    ctl protection org.example.notes --class data-app --user 501
+    [[ "$answer" == *"recorded   1"* ]] || fail "the class is not recorded"
+}
+
+# A boot: what was meant to last until then goes.
+reboot() {
+    say "The device reboots. What was transient goes, and so does data that is nobody's."
+    mkdir "$root/private/var/mobile/Containers/Data/Application/Junk"
+    kill -KILL "$daemon"
+    wait "$daemon" 2>/dev/null || true
+    echo "\$ zorvaned --forget-boot"
+    startDaemon --forget-boot
+    [[ ! -e "$root/private/var/mobile/Containers/Data/Application/Junk" ]] || fail "the orphan is still there"
+    [[ -z "$("$binaries/zorvanectl" --root "$root" list --class data-app --user 501 --transient --json | tr -d '[]')" ]] ||
+        fail "a transient container outlived the boot"
+    ctl status
+}
+
 # What lies below a folder of the root, indented by depth, directories with a slash.
 tree() {
     (cd "$root" && find "$1" -mindepth 1 \( -type d -printf '%P/\n' \) -o -printf '%P\n') | LC_ALL=C sort |
@@ -182,6 +235,10 @@ ctl create org.example.scratch --class data-app --user 501 --transient
 say "Death row is emptied in the background. This waits until it is."
 ctl empty-death-row
 [[ -z "$(ls -A "$root/private/var/root/Library/Caches/com.veltra.zorvaned/Dead")" ]] || fail "death row is not empty"
+
+lifecycle
+protection
+reboot
 
 if [[ -n "$(whyNoSandbox)" ]]; then
     say "Here two applications would run in sandboxes. This part is left out: $(whyNoSandbox)."

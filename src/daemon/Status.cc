@@ -3,6 +3,7 @@
 
 #include "ipc/Keys.h"
 #include "platform/EntitlementKeys.h"
+#include "protection/ZORDataProtectionManager.h"
 
 namespace zor {
 
@@ -60,6 +61,26 @@ void Status::addEntitlements(plist::Dictionary& status) {
     status.set(ipc::keys::statusEntitlements, std::move(map));
 }
 
+void Status::addProtection(plist::Dictionary& counters) {
+    plist::Array pending;
+    for (const auto& change : composition_.store().dataProtection.pending())
+        pending.emplace_back(plist::Dictionary{{"Identifier", change.identifier},
+                                               {"UserID", change.userId},
+                                               {"ContainerClass", static_cast<std::uint64_t>(change.containerClass)},
+                                               {"ProtectionClass", change.dataProtectionClass}});
+    counters.set("PendingProtectionChanges", std::move(pending));
+    const auto held = composition_.platform().assertions.held();
+    counters.set("HeldAssertions", plist::Array(held.begin(), held.end()));
+}
+
+void Status::addSetup(plist::Dictionary& counters) {
+    plist::Array passes;
+    for (const auto& pass : composition_.store().setup.passes())
+        passes.emplace_back(
+            plist::Dictionary{{"Pass", pass.name}, {"Changed", pass.changed}, {"Microseconds", pass.microseconds}});
+    counters.set("LastSetup", std::move(passes));
+}
+
 plist::Dictionary Status::counters() {
     const platform::Platform& platform = composition_.platform();
     const auto messages = composition_.dispatcher().counts();
@@ -77,6 +98,8 @@ plist::Dictionary Status::counters() {
         {"EntitlementEntries", static_cast<std::uint64_t>(composition_.entitlements().entryCount())},
         {"ProtectionClassesSupported", platform.protection.supported()},
     };
+    addProtection(counters);
+    addSetup(counters);
     if (const auto lost = composition_.entitlements().lostFile())
         counters.set("UnreadableEntitlementFile", lost->path());
     platformCounters_(counters);

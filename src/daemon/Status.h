@@ -24,6 +24,8 @@ public:
 
 private:
     [[nodiscard]] plist::Dictionary counters();
+    void addProtection(plist::Dictionary& counters);
+    void addSetup(plist::Dictionary& counters);
     void addEntitlements(plist::Dictionary& status);
 
     Composition& composition_;

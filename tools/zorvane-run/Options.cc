@@ -25,6 +25,7 @@ a read-only system, and nothing else of any user. What is missing is made.
   --read-only DIR        show DIR too, read-only: the program's own files; may repeat
   --root DIR             system root of the daemon (default /)
   --bubblewrap FILE      the program that makes the sandbox (default /usr/bin/bwrap)
+  --wait                 wait while the daemon keeps the program from being started
   --dry-run              say what would be mounted, run nothing
   --json                 the same, and errors, as JSON
   --help, --version
@@ -32,6 +33,7 @@ a read-only system, and nothing else of any user. What is missing is made.
 Without a group named, all those registered for the identifier are there; one that is
 named has to be registered ('zorvanectl entitlements set'), since the next boot deletes
 containers that nothing registered refers to. The same holds for the system container.
+While the data protection of its files is being changed, a program is not started.
 
 The program finds HOME (its data container), TMPDIR (in it), ZORVANE_IDENTIFIER,
 ZORVANE_SYSTEM_CONTAINER (a path, where there is one), and ZORVANE_APP_GROUPS and
@@ -77,6 +79,7 @@ enum Option : int {
     readOnly,
     bubblewrap,
     dryRun,
+    wait,
     json,
     helpText,
     version
@@ -92,6 +95,7 @@ constexpr option known[] = {
     {"read-only", required_argument, nullptr, Option::readOnly},
     {"bubblewrap", required_argument, nullptr, Option::bubblewrap},
     {"dry-run", no_argument, nullptr, Option::dryRun},
+    {"wait", no_argument, nullptr, Option::wait},
     {"json", no_argument, nullptr, Option::json},
     {"help", no_argument, nullptr, Option::helpText},
     {"version", no_argument, nullptr, Option::version},
@@ -128,6 +132,9 @@ std::optional<OptionsEnd> take(int option, const char* value, const char* argume
         return std::nullopt;
     case Option::dryRun:
         options.dryRun = true;
+        return std::nullopt;
+    case Option::wait:
+        options.wait = true;
         return std::nullopt;
     case Option::json:
         options.json = true;

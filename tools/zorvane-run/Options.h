@@ -23,6 +23,8 @@ struct Options {
     std::vector<std::string> readOnly;
     std::string bubblewrap = "/usr/bin/bwrap";
     bool dryRun = false;
+    /// Wait for as long as the daemon keeps the program from being started.
+    bool wait = false;
     bool json = false;
     /// The program and its arguments; never empty.
     std::vector<std::string> command;

@@ -3,6 +3,7 @@
 // manager calls it as root.
 //
 // What a kill leaves: the containers that were made so far, each whole; the sandbox ends with this process.
+#include "Assertion.h"
 #include "Descriptors.h"
 #include "Inside.h"
 #include "Mounts.h"
@@ -40,6 +41,9 @@ Result<int> run(const Options& options) {
     const auto root = Root::open(options.root);
     if (!root)
         return std::unexpected(root.error());
+    if (!options.dryRun)
+        if (const auto free = checkAssertion(*root, options); !free)
+            return std::unexpected(free.error());
     const auto wanted = chooseContainers(options);
     if (!wanted)
         return std::unexpected(wanted.error());

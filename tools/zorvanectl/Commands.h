@@ -50,6 +50,21 @@ int infoSet(const zorvane::ConnectOptions& connect, const Output& output, const 
 int infoUnset(const zorvane::ConnectOptions& connect, const Output& output, const Target& target,
               const std::string& key);
 
+// ProtectionCommands.cc
+struct Protection {
+    std::int32_t protectionClass = 0;
+    bool thirdParty = false;
+    /// Say that a change is pending rather than wait for an unlock.
+    bool noWait = false;
+    bool failIfLocked = false;
+};
+int protect(const zorvane::ConnectOptions& connect, const Output& output, const Target& target,
+            const Protection& protection);
+/// The recorded class, the one on the disk, and a change that is pending.
+int protection(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
+/// Shows the device's lock state, and sets it before that when one is given.
+int lockState(const zorvane::ConnectOptions& connect, const Output& output, const std::optional<int>& state);
+
 // EntitlementCommands.cc
 struct Registration {
     std::string identifier;

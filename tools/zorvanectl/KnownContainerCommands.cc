@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // What is done with a container that is there: replacing, wiping, repairing, measuring it, and its info values.
 #include "Commands.h"
+#include "KnownContainer.h"
 
 #include <algorithm>
 
@@ -10,45 +11,8 @@ namespace {
 
 using zorvane::Client;
 
-constexpr std::uint64_t codeNotFound = 21;
-
-std::uint32_t userOf(const Target& target) {
-    return target.user.value_or(zorvane::defaultUserOfClass(target.containerClass));
-}
-
 std::string named(const Target& target) {
     return target.identifier + " in " + std::string(zorvane::containerClassName(target.containerClass));
-}
-
-/// The address of a container, by its identifier. Asking for it otherwise would discard a transient one.
-zorvane::Result<Client::Address> find(Client& client, const Target& target, bool transient) {
-    const auto containers = client.list(target.containerClass, userOf(target), transient);
-    if (!containers)
-        return std::unexpected(containers.error());
-    const auto found = std::ranges::find(*containers, target.identifier, &zorvane::ListedContainer::identifier);
-    if (found == containers->end())
-        return std::unexpected(zorvane::Error{.kind = zorvane::Error::Kind::daemon,
-                                              .code = codeNotFound,
-                                              .message = std::string("there is no ") +
-                                                         (transient ? "transient" : "live") +
-                                                         " container of this identifier"});
-    return Client::Address{.containerClass = target.containerClass,
-                           .user = userOf(target),
-                           .identifier = target.identifier,
-                           .uuid = found->uuid};
-}
-
-/// Connects, finds the container, and does with it what is to be done.
-template <typename Body>
-int withContainer(const zorvane::ConnectOptions& connect, const Output& output, const Target& target,
-                  const std::string& what, Body&& body) {
-    auto client = Client::connect(connect);
-    if (!client)
-        return output.error(client.error(), what);
-    const auto address = find(*client, target, target.transient);
-    if (!address)
-        return output.error(address.error(), what);
-    return body(*client, *address);
 }
 
 int done(const zorvane::Result<void>& result, const Output& output, const std::string& what, const Target& target,

@@ -18,6 +18,7 @@ Examples:
   zorvanectl delete org.example.notes org.example.maps --class data-app
   zorvanectl entitlements set org.example.notes --app-group group.org.example
   zorvanectl why org.example.notes
+  zorvanectl protect org.example.notes 1 --class data-app --third-party
   zorvanectl status
 
 Classes, by number, name, or the beginning of one name in lower case (data-app):
@@ -42,6 +43,8 @@ struct Arguments {
     bool yes = false;
     std::string group;
     Registration registration;
+    Protection protection;
+    std::optional<int> lockState;
 };
 
 /// Accepts what containerClassOf knows, with an error that lists nothing twice: --help does.
@@ -155,6 +158,41 @@ void addKnownContainerCommands(CLI::App& app, Arguments& arguments, Action& acti
     set->add_option("value", arguments.value, "JSON; what is none is taken as a string")->required();
 }
 
+void addProtectionCommands(CLI::App& app, Arguments& arguments, Action& action) {
+    Protection& protection = arguments.protection;
+    const auto make = [&](const char* name, const char* help, auto&& run) {
+        CLI::App* command = app.add_subcommand(name, help);
+        command->callback([&arguments, &action, command, run] {
+            if (command->get_option_no_throw("--class"))
+                finishTarget(*command, arguments);
+            action = [&arguments, run](const Output& output) { return run(arguments, output); };
+        });
+        return command;
+    };
+    CLI::App* protect = make(
+        "protect", "Change the data-protection class of a container; waits for an unlock",
+        [](const Arguments& a, const Output& o) { return zorvanectl::protect(a.connect, o, a.target, a.protection); });
+    CLI::App* show =
+        make("protection", "Show a container's data-protection class, and a change that is pending",
+             [](const Arguments& a, const Output& o) { return zorvanectl::protection(a.connect, o, a.target); });
+    for (CLI::App* command : {protect, show}) {
+        command->add_option("identifier", arguments.target.identifier, "Identifier")->required();
+        addTargetOptions(*command, arguments);
+    }
+    protect
+        ->add_option("protection-class", protection.protectionClass,
+                     "0 none, 1 only while unlocked, 3 from the first unlock")
+        ->required();
+    protect->add_flag("--third-party", protection.thirdParty, "It is no program of the system's own");
+    CLI::Option* noWait = protect->add_flag("--no-wait", protection.noWait,
+                                            "Say that the change is pending rather than wait for an unlock");
+    protect->add_flag("--fail-if-locked", protection.failIfLocked, "Fail where the device is locked")->excludes(noWait);
+    CLI::App* lockState =
+        make("lock-state", "Show the device's lock state, or set it for a root that is not /",
+             [](const Arguments& a, const Output& o) { return zorvanectl::lockState(a.connect, o, a.lockState); });
+    lockState->add_option("state", arguments.lockState, "0 unlocked, 1 locked");
+}
+
 void addEntitlementCommands(CLI::App& app, Arguments& arguments, Action& action) {
     Registration& registration = arguments.registration;
     CLI::App* entitlements = app.add_subcommand("entitlements", "What an identifier is entitled to");
@@ -234,6 +272,7 @@ int main(int argumentCount, char** argumentValues) {
     app.footer(footer);
     addContainerCommands(app, arguments, action);
     addKnownContainerCommands(app, arguments, action);
+    addProtectionCommands(app, arguments, action);
     addEntitlementCommands(app, arguments, action);
     addGroupCommands(app, arguments, action);
     try {

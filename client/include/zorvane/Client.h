@@ -62,6 +62,9 @@ struct ListedContainer {
     std::string identifier;
 };
 
+/// The info key under which a container's data-protection class is recorded, an integer; absent means 3.
+[[nodiscard]] std::string_view protectionClassInfoKey();
+
 /// 36 characters, upper-case.
 [[nodiscard]] std::string uuidText(const std::array<std::uint8_t, 16>& uuid);
 
@@ -121,6 +124,22 @@ public:
     [[nodiscard]] Result<void> regenerateDirectoryUUID(const Address& address);
     /// Bytes on the disk.
     [[nodiscard]] Result<std::uint64_t> diskUsage(const Address& address);
+
+    struct ProtectionChange {
+        std::uint64_t containerClass = 0;
+        std::uint32_t user = currentMobileUser;
+        std::string identifier;
+        /// 0, 1, 3, or for the system's own programs another; never 2.
+        std::int32_t protectionClass = 0;
+        /// The container is not one of the system's own programs.
+        bool thirdParty = false;
+        /// Where the device is locked, wait for its unlock and try again. The answer comes after that, so the call may
+        /// take as long as the device stays locked.
+        bool retryIfLocked = false;
+    };
+    /// Changes the data-protection class of a data container. Codes 38: a class that may not be asked for; 61: the
+    /// device is locked; 10, 21: the container was moved or went meanwhile.
+    [[nodiscard]] Result<void> setDataProtection(const ProtectionChange& change);
 
     // Shared containers. An empty identifier is the caller's own; paths are of containers that are made when they are
     // first asked for.

@@ -1,0 +1,77 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "Assertion.h"
+
+#include "ipc/Names.h"
+#include "platform/PercentEncoding.h"
+#include "platform/TerminationAssertionService.h"
+#include "platform/linux/Openat2.h"
+
+#include <cerrno>
+#include <charconv>
+#include <fcntl.h>
+#include <string_view>
+#include <sys/file.h>
+#include <unistd.h>
+
+namespace zorvanerun {
+
+using zor::platform::FileDescriptor;
+
+namespace {
+
+namespace platform = zor::platform;
+
+Failure cannotLook(const std::string& path, int number) {
+    return {.what = withReason("cannot look whether the program may be started: " + path, number),
+            .advice = "look who owns that directory: it is the daemon's"};
+}
+
+std::string_view reasonIn(int file) {
+    char text[8] = {};
+    const ssize_t bytes = ::pread(file, text, sizeof text, 0);
+    unsigned number = static_cast<unsigned>(platform::TerminationReason::critical);
+    if (bytes > 0)
+        std::from_chars(text, text + bytes, number);
+    return platform::terminationReasonText(static_cast<platform::TerminationReason>(number));
+}
+
+/// 0 when nobody holds the file, EWOULDBLOCK when somebody does, or another errno.
+int tryLock(int file, int operation) {
+    int result = 0;
+    do {
+        result = ::flock(file, operation);
+    } while (result != 0 && errno == EINTR);
+    return result == 0 ? 0 : errno;
+}
+
+} // namespace
+
+Result<void> checkAssertion(const Root& root, const Options& options) {
+    const std::string name = platform::percentEncode(options.identifier);
+    if (name.size() > platform::componentBytesMax)
+        return {}; // the daemon holds none on such an identifier
+    const std::string relative =
+        std::string(zor::ipc::runtimeDirectory) + "/" + std::string(zor::ipc::assertionDirectory) + "/" + name;
+    // Each assertion has a file of its own: behind one that ended, the next may be held already.
+    for (;;) {
+        const auto file = platform::openBeneath(root.descriptor.get(), relative.c_str(), O_RDONLY | O_NONBLOCK);
+        if (!file && file.error() == ENOENT)
+            return {};
+        if (!file)
+            return std::unexpected(cannotLook(root.below("/" + relative), file.error()));
+        int failure = tryLock(file->get(), LOCK_SH | LOCK_NB);
+        if (failure == EWOULDBLOCK && options.wait)
+            failure = tryLock(file->get(), LOCK_SH);
+        else if (failure == 0)
+            return {}; // left by a daemon that was killed
+        if (failure == EWOULDBLOCK)
+            return std::unexpected(Failure{
+                .what = options.identifier + " may not be started now: " + std::string(reasonIn(file->get())),
+                .advice = "wait until that has ended (a change of data protection ends after the device has been "
+                          "unlocked): --wait does, and 'zorvanectl status' shows what is held"});
+        if (failure != 0)
+            return std::unexpected(cannotLook(root.below("/" + relative), failure));
+    }
+}
+
+} // namespace zorvanerun

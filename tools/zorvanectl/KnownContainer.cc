@@ -1,0 +1,29 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "KnownContainer.h"
+
+#include <algorithm>
+
+namespace zorvanectl {
+
+std::uint32_t userOf(const Target& target) {
+    return target.user.value_or(zorvane::defaultUserOfClass(target.containerClass));
+}
+
+zorvane::Result<zorvane::Client::Address> find(zorvane::Client& client, const Target& target, bool transient) {
+    const auto containers = client.list(target.containerClass, userOf(target), transient);
+    if (!containers)
+        return std::unexpected(containers.error());
+    const auto found = std::ranges::find(*containers, target.identifier, &zorvane::ListedContainer::identifier);
+    if (found == containers->end())
+        return std::unexpected(zorvane::Error{.kind = zorvane::Error::Kind::daemon,
+                                              .code = codeNotFound,
+                                              .message = std::string("there is no ") +
+                                                         (transient ? "transient" : "live") +
+                                                         " container of this identifier"});
+    return zorvane::Client::Address{.containerClass = target.containerClass,
+                                    .user = userOf(target),
+                                    .identifier = target.identifier,
+                                    .uuid = found->uuid};
+}
+
+} // namespace zorvanectl
