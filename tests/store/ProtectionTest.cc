@@ -22,7 +22,6 @@ using support::hasLine;
 using Request = ZORDataProtectionManager::Request;
 
 constexpr const char* function = "setDataProtectionOnDataContainerForUser";
-constexpr const char* pass = "_runChangeOperationNeedToRetry";
 constexpr const char* perform = "performChangeOperation";
 constexpr const char* key = "com.veltra.Brevance.ContentProtectionClass";
 

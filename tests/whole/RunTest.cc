@@ -9,6 +9,7 @@
 #include <fstream>
 #include <gtest/gtest.h>
 #include <sstream>
+#include <sys/file.h>
 #include <sys/wait.h>
 #include <thread>
 
@@ -145,6 +146,32 @@ public:
 private:
     pid_t pid_ = -1;
 };
+
+// Goal: while the daemon changes a program's files, the program is not started, or is started when that has ended; a
+// file that a killed daemon left keeps nobody. Method: a lock on the assertion's file, held and let go by the test.
+TEST(Run, TerminationAssertions) {
+    ZOR_NEEDS_SANDBOX();
+    Launcher launcher;
+    const std::string file = launcher.daemon.path("run/zorvane/assertions/") + notes;
+    files::create_directory(launcher.daemon.path("run/zorvane/assertions"));
+    writeFile(file, "0", 0600);
+    EXPECT_EQ(launcher.run(notes, {"--", "true"}).exitStatus, 0);
+    const int held = ::open(file.c_str(), O_RDONLY | O_CLOEXEC);
+    ASSERT_EQ(::flock(held, LOCK_EX | LOCK_NB), 0);
+    const auto refused = launcher.run(notes, {"--", "true"});
+    EXPECT_EQ(refused.exitStatus, 125);
+    EXPECT_NE(refused.output.find("may not be started now: its files are being changed"), std::string::npos)
+        << refused.output;
+    EXPECT_EQ(launcher.run(maps, {"--", "true"}).exitStatus, 0);
+    const std::string output = launcher.daemon.path("waited");
+    Background waiting(launcher.words(notes, {"--wait", "--", "echo", "started"}), output);
+    std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    EXPECT_EQ(contentOf(output), "");
+    ::unlink(file.c_str());
+    ::close(held);
+    EXPECT_EQ(waiting.end(), 0);
+    EXPECT_EQ(contentOf(output), "started\n");
+}
 
 } // namespace
 

@@ -1,0 +1,174 @@
+// SPDX-License-Identifier: Apache-2.0
+// The first launch of a boot over a device that an older system left, with each of its calls failing and the daemon
+// ending at each.
+#include "crash/StoreWorld.h"
+#include "entitlements/ZOREntitlementMapping.h"
+#include "plist/Binary.h"
+#include "support/FaultLoop.h"
+#include "support/ProcessResources.h"
+
+#include <filesystem>
+#include <fstream>
+#include <gtest/gtest.h>
+#include <sstream>
+#include <stdexcept>
+#include <unistd.h>
+
+namespace zor::support {
+namespace {
+
+namespace files = std::filesystem;
+
+constexpr const char* bundleUuid = "11111111-0000-4000-8000-000000000000";
+constexpr const char* wellknownUuid = "22222222-0000-4000-8000-000000000000";
+constexpr const char* dataUuid = "33333333-0000-4000-8000-000000000000";
+constexpr const char* unentitledUuid = "44444444-0000-4000-8000-000000000000";
+constexpr const char* metadataName = ".com.veltra.zorvane.metadata.plist";
+
+struct Kind {
+    std::uint64_t number;
+    std::uint32_t user;
+    std::uint32_t owner;
+    std::vector<const char*> inside;
+    mode_t insideMode;
+};
+const Kind bundle = {1, 501, 501, {}, 0};
+const Kind data = {2, 501, 501, {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp"}, 0755};
+const Kind system = {12, 499, 0, {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp"}, 0777};
+
+void give(const files::path& path, std::uint32_t owner) {
+    if (::geteuid() == 0 && ::lchown(path.c_str(), owner, owner) != 0)
+        throw std::runtime_error("cannot give away " + path.string());
+}
+
+void put(const files::path& path, const Kind& kind, const std::string& identifier, const plist::Dictionary& info = {}) {
+    files::create_directories(path);
+    for (files::path level = path; level.filename() != "var"; level = level.parent_path())
+        give(level, level == path || kind.user == 501 ? kind.owner : 0);
+    for (const char* inside : kind.inside) {
+        files::create_directory(path / inside);
+        files::permissions(path / inside, static_cast<files::perms>(kind.insideMode));
+        give(path / inside, kind.owner);
+    }
+    plist::Dictionary metadata{{"ZORMetadataContentClass", kind.number},
+                               {"ZORMetadataPersona", kind.user},
+                               {"ZORMetadataIdentifier", identifier},
+                               {"ZORMetadataUUID", path.filename().string()}};
+    if (!info.empty())
+        metadata.set("ZORMetadataInfo", info);
+    const auto bytes = plist::writeBinary(metadata).value();
+    std::ofstream(path / metadataName, std::ios::binary)
+        .write(reinterpret_cast<const char*>(bytes.data()), static_cast<std::streamsize>(bytes.size()));
+    std::ofstream(path / "content") << identifier;
+    give(path / "content", kind.owner);
+}
+
+struct OldDevice {
+    OldDevice(FaultDisk& faultDisk) : disk(faultDisk), device("/dev/shm") {
+        device.marker.make();
+        device.start(disk, journalEverywhere);
+        const std::string key(entitlementKeys::systemContainer);
+        if (!device.daemon->composition().entitlements()._setEntitlementDictionaryValues(
+                {plist::Dictionary{{key, true}}}, {"com.veltra.settingsd"}))
+            throw std::runtime_error("no entitlements");
+        device.daemon.reset();
+        const files::path var = device.root.path() + "/private/var";
+        put(var / "mobile/Containers/Bundle/Application" / bundleUuid, bundle, "com.example.bundle");
+        put(var / "mobile/Containers/Data/Application" / dataUuid, data, "com.example.data",
+            {{"com.veltra.Brevance.GroupContainerIDs", plist::Array{"group.old"}}});
+        put(var / "containers/Data/System" / wellknownUuid, system, "com.veltra.settingsd");
+        put(var / "containers/Data/System" / unentitledUuid, system, "com.example.unentitled");
+        put(var / "mobile/Containers/Data/Application/Junk", data, "junk");
+        device.marker.forget();
+    }
+
+    FaultDisk& disk;
+    ProcessResources before;
+    Device device;
+};
+
+std::string contentOf(const files::path& path) {
+    std::ostringstream text;
+    text << std::ifstream(path / "content").rdbuf();
+    return text.str();
+}
+
+std::uint64_t changesOf(StoreDaemon& daemon) {
+    std::uint64_t changes = 0;
+    for (const auto& pass : daemon.composition().store().setup.passes())
+        changes += pass.changed;
+    return changes;
+}
+
+/// What the old device must have become. A bundle whose record could not be written for once stays unknown, in place
+/// and whole: the migration is not made again for its sake.
+enum class Bundle { known, inPlace };
+std::string judgeMigrated(const std::string& root, StoreDaemon& daemon, Bundle expected) {
+    const files::path var = root + "/private/var";
+    if (contentOf(var / "containers/Bundle/Application" / bundleUuid) != "com.example.bundle" ||
+        files::exists(var / "mobile/Containers/Bundle"))
+        return "the bundle is not where it belongs";
+    if (contentOf(var / "containers/Data/System/com.veltra.settingsd") != "com.veltra.settingsd")
+        return "the well-known container is not under its name";
+    if (files::exists(var / "containers/Data/System" / unentitledUuid))
+        return "an unentitled system container is still there";
+    if (files::exists(var / "mobile/Containers/Data/Application/Junk"))
+        return "an orphan is still there";
+    const auto groups = daemon.composition().entitlements().appGroupIdentifiersForIdentifier("com.example.data");
+    if (!groups || *groups != std::vector<std::string>{"group.old"})
+        return "the group identifiers are lost";
+    std::vector<Request> known = {{"com.example.data", ContainerClass::dataApplication, 501},
+                                  {"com.veltra.settingsd", ContainerClass::dataSystem, 499}};
+    if (expected == Bundle::known)
+        known.push_back({"com.example.bundle", ContainerClass::bundleApplication, 33});
+    for (const Request& request : known)
+        if (!daemon.lookUp(request).acknowledged)
+            return request.identifier + " is not found";
+    return expected == Bundle::known ? judgeStore(readTree(root, {"run"}), Transients::judged).complaint : "";
+}
+
+std::string judge(OldDevice& old, const FaultOutcome& outcome) {
+    const Bundle expected = outcome.met && !outcome.stopped ? Bundle::inPlace : Bundle::known;
+    Device& device = old.device;
+    device.daemon.reset();
+    if (std::string leaked = old.before.leakedSince(); !leaked.empty())
+        return "leaked: " + leaked;
+    platform::LinuxDisk disk;
+    for (const bool isLast : {false, true}) {
+        device.marker.forget();
+        StoreDaemon daemon(device.root.path(), device.marker, disk, journalEverywhere);
+        daemon.launch();
+        if (std::string complaint = judgeMigrated(device.root.path(), daemon, expected); !complaint.empty())
+            return "after the next boot: " + complaint + daemon.log();
+        // The transient directories, two of the system's and one of the user's, go at each boot.
+        constexpr std::uint64_t transientDirectories = 3;
+        if (isLast && changesOf(daemon) != transientDirectories)
+            return "the boot after it found something to do: " + daemon.log();
+    }
+    return "";
+}
+
+// Goal: whatever call of a boot's setup fails, and wherever the daemon ends in it, the next boot brings an older
+// system's containers to their places, loses none, and the one after it has nothing left to do. Method: one of each
+// kind, and the fault at the first, second, ... call of the first boot until it meets none.
+TEST(BootFaultTest, TheNextBootFinishesIt) {
+    for (const Fault& fault : {Fault{.kind = FaultKind::error, .error = EIO},
+                               Fault{.kind = FaultKind::error, .error = ENOSPC, .span = FaultSpan::fromThenOn},
+                               Fault{.kind = FaultKind::stop}}) {
+        SCOPED_TRACE(fault.describe());
+        platform::LinuxDisk linuxDisk;
+        const LoopReport report = forEachFaultPoint(
+            linuxDisk, fault, [](FaultDisk& disk) { return std::make_unique<OldDevice>(disk); },
+            [](const std::unique_ptr<OldDevice>& old) {
+                old->device.daemon = std::make_unique<StoreDaemon>(old->device.root.path(), old->device.marker,
+                                                                   old->disk, journalEverywhere);
+                old->device.daemon->launch();
+            },
+            [](const std::unique_ptr<OldDevice>& old, const FaultOutcome& outcome) { return judge(*old, outcome); });
+        EXPECT_EQ(report.complaint, "");
+        EXPECT_GT(report.examined, 30U);
+    }
+}
+
+} // namespace
+} // namespace zor::support
