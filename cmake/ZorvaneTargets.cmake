@@ -27,21 +27,20 @@ target_include_directories(zor_options INTERFACE ${CMAKE_SOURCE_DIR}/src)
 set(CMAKE_POSITION_INDEPENDENT_CODE OFF)
 target_compile_options(zor_options INTERFACE -fPIC)
 
-# Half of a translation unit's time went into the standard library's headers. Every source still includes what it uses: the lint
-# build goes without.
+# Half of a translation unit's time went into the standard library's headers. Every source that is installed still includes what
+# it uses: where clang-tidy looks at it, it goes without.
 option(ZORVANE_PCH "Precompile the standard headers" ON)
-if(ZORVANE_TIDY)
-    set(ZORVANE_PCH OFF)
-endif()
 if(ZORVANE_PCH)
     file(CONFIGURE OUTPUT ${CMAKE_BINARY_DIR}/pch.cc CONTENT "")
     add_library(zor_pch STATIC ${CMAKE_BINARY_DIR}/pch.cc)
+    set_target_properties(zor_pch PROPERTIES CXX_CLANG_TIDY "")
     target_link_libraries(zor_pch PRIVATE zor_options)
     target_precompile_headers(zor_pch PRIVATE <algorithm> <atomic> <condition_variable> <deque> <expected> <functional>
         <map> <memory> <mutex> <optional> <set> <span> <string> <string_view> <thread> <unordered_set> <variant> <vector>)
 endif()
 function(zor_use_pch target)
-    if(ZORVANE_PCH)
+    get_target_property(tidy ${target} CXX_CLANG_TIDY)
+    if(ZORVANE_PCH AND NOT tidy)
         target_precompile_headers(${target} REUSE_FROM zor_pch)
     endif()
 endfunction()
