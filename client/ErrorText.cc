@@ -23,9 +23,7 @@ constexpr Row rows[] = {
     {8, {"the finished container could not be moved into its class directory", seeDisk}},
     {9, {"the half-made container could not be taken away", seeDisk}},
     {10, {"the container is no longer where it was; the operation was cancelled", "try again"}},
-    {11,
-     {"the request is not valid, or this version does not serve the command",
-      "check identifier, class and user; the daemon's log names what was wrong"}},
+    {11, {"the request is not valid", "check identifier, class and user; the daemon's log names what was wrong"}},
     {12, {"the container's metadata file cannot be read", seeLog}},
     {14, {"the old container could not be moved aside", seeDisk}},
     {15, {"the new container could not be moved into place", seeDisk}},
@@ -43,8 +41,9 @@ constexpr Row rows[] = {
     {35, {"the journal of a replace is unreadable or could not be recovered", seeLog}},
     {36, {"a replace was done, but not cleaned up", seeLog}},
     {38,
-     {"this user, key or class is not allowed here", "bundles belong to user 33, system containers to 499, all others "
-                                                     "to 501 to 510; a mobile user acts only as itself"}},
+     {"this user, key, class or data-protection class is not allowed here",
+      "bundles belong to user 33, system containers to 499, all others "
+      "to 501 to 510; a mobile user acts only as itself"}},
     {40, {"the daemon caught an exception", "report it with the daemon's log"}},
     {41, {"the container could not be moved to death row", seeDisk}},
     {43, {"the containers of this class could not be read", "the daemon's log says which directory and why"}},
@@ -70,6 +69,13 @@ ErrorText errorText(std::uint64_t code) {
         if (row.code == code)
             return row.text;
     return {"the daemon met an error that this client does not know", seeLog};
+}
+
+std::vector<std::uint64_t> errorCodes() {
+    std::vector<std::uint64_t> codes;
+    for (const Row& row : rows)
+        codes.push_back(row.code);
+    return codes;
 }
 
 } // namespace zorvane

@@ -302,6 +302,7 @@ TEST(Client, EveryCodeHasItsWords) {
         EXPECT_NE(std::string(errorText(code).advice), "") << code;
     }
     EXPECT_EQ(errorText(~std::uint64_t{0}).meaning, unknown);
+    EXPECT_TRUE(std::ranges::is_sorted(errorCodes()));
 }
 
 // Goal: people's words for classes mean the right number and nothing vague means any. Method: full names, numbers, the

@@ -65,6 +65,10 @@ int protection(const zorvane::ConnectOptions& connect, const Output& output, con
 /// Shows the device's lock state, and sets it before that when one is given.
 int lockState(const zorvane::ConnectOptions& connect, const Output& output, const std::optional<int>& state);
 
+// Explain.cc
+/// One code of the daemon's; empty: all of them.
+int explain(const Output& output, const std::string& text);
+
 // EntitlementCommands.cc
 struct Registration {
     std::string identifier;

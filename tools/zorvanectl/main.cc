@@ -45,6 +45,7 @@ struct Arguments {
     Registration registration;
     Protection protection;
     std::optional<int> lockState;
+    std::string code;
 };
 
 /// Accepts what containerClassOf knows, with an error that lists nothing twice: --help does.
@@ -105,6 +106,9 @@ void addContainerCommands(CLI::App& app, Arguments& arguments, Action& action) {
         addTargetOptions(*command, arguments);
     make("empty-death-row", "Delete what waits for deletion, and wait for it",
          [](const Arguments& a, const Output& o) { return zorvanectl::emptyDeathRow(a.connect, o); });
+    make("explain", "Say what a code of the daemon means, and what to do; without one, list them",
+         [](const Arguments& a, const Output& o) { return zorvanectl::explain(o, a.code); })
+        ->add_option("code", arguments.code, "The number");
     make("status", "Show whom the daemon takes this program for, and how it is doing",
          [](const Arguments& a, const Output& o) { return zorvanectl::status(a.connect, o); });
 }

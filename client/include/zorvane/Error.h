@@ -4,6 +4,7 @@
 
 #include <cstdint>
 #include <string>
+#include <vector>
 
 namespace zorvane {
 
@@ -33,5 +34,7 @@ struct ErrorText {
     const char* advice;
 };
 [[nodiscard]] ErrorText errorText(std::uint64_t code);
+/// Every code that errorText has words for, in ascending order.
+[[nodiscard]] std::vector<std::uint64_t> errorCodes();
 
 } // namespace zorvane
