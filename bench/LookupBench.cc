@@ -3,6 +3,7 @@
 // on several, where the kernel happens to wake the other side decides more than the work does.
 #include "Benchmarks.h"
 #include "Echo.h"
+#include "RoundTripPairs.h"
 
 namespace zor::bench {
 
@@ -24,34 +25,10 @@ std::vector<Figure> measureLookup(const Settings& settings) {
     const Echo echo(place.path(), request.size(), reply, {.processor = processor});
     Client floorClient = echo.connect();
     const Pinned pinned(processor);
-    Pairs halves;
-    std::vector<double> all;
-    std::vector<double> floorAll;
-    for (int block = -1; block < blocks; ++block) {
-        const auto measured = roundTrips(client, request, reply, requests);
-        const auto floor = roundTrips(floorClient, request, reply, requests);
-        if (block < 0) // warms up
-            continue;
-        halves.measured.push_back(median(measured));
-        halves.floor.push_back(median(floor));
-        all.insert(all.end(), measured.begin(), measured.end());
-        floorAll.insert(floorAll.end(), floor.begin(), floor.end());
-    }
-    const double p99 = percentile(all, 0.99);
-    const double floorP99 = percentile(floorAll, 0.99);
-    return {{.name = "lookup.p50",
-             .what = "lookup round trip, one processor, p50",
-             .measured = text("%.2f us", halves.measuredMedian()),
-             .floor = text("%.2f us", halves.floorMedian()),
-             .value = halves.ratio(),
-             .unit = "x",
-             .goal = 2.0,
-             .remark = text("p99 %.2f us, of the floor %.2f us; request %zu bytes, reply %zu", p99, floorP99,
-                            request.size(), reply.size()),
-             .numbers = {{"p50us", halves.measuredMedian()},
-                         {"p99us", p99},
-                         {"floorP50us", halves.floorMedian()},
-                         {"floorP99us", floorP99}}}};
+    return {roundTripsInTurns(
+                blocks, [&] { return roundTrips(client, request, reply, requests); },
+                [&] { return roundTrips(floorClient, request, reply, requests); })
+                .figure("lookup.p50", "lookup round trip, one processor, p50", 2.0, request, reply)};
 }
 
 } // namespace zor::bench

@@ -2,6 +2,7 @@
 // What it costs to keep entitlements up to date: registering what is registered already, and admitting a peer whose
 // registration is its own. Both against a lookup in the same daemon, on one processor.
 #include "Benchmarks.h"
+#include "RoundTripPairs.h"
 
 #include "entitlements/ZOREntitlementMapping.h"
 #include "ipc/Keys.h"
@@ -81,28 +82,18 @@ std::vector<Figure> measureRegistration(const Settings& settings) {
 
     const Pinned pinned(processor);
     const ino_t fileBefore = entitlementFile(place.path());
-    Pairs registering;
-    for (int block = -1; block < blocks; ++block) {
-        const double measured = median(roundTrips(client, unchanged, accepted, requests));
-        const double floor = median(roundTrips(client, lookup, found, requests));
-        if (block < 0) // warms up
-            continue;
-        registering.measured.push_back(measured);
-        registering.floor.push_back(floor);
-    }
+    const auto lookUp = [&] { return roundTrips(client, lookup, found, requests); };
+    const Pairs registering =
+        roundTripsInTurns(blocks, [&] { return roundTrips(client, unchanged, accepted, requests); }, lookUp).blocks;
     if (entitlementFile(place.path()) != fileBefore)
         throw Failure("registering what is registered wrote the entitlement file");
-    Pairs admission;
-    for (int block = -1; block < blocks; ++block) {
-        (void)firstReply(client, byCaller);
-        const double measured = median(roundTrips(client, lookup, found, requests));
-        (void)firstReply(client, byInstaller);
-        const double floor = median(roundTrips(client, lookup, found, requests));
-        if (block < 0)
-            continue;
-        admission.measured.push_back(measured);
-        admission.floor.push_back(floor);
-    }
+    const auto lookUpAfter = [&](const Frame& registered) {
+        (void)firstReply(client, registered);
+        return lookUp();
+    };
+    const Pairs admission = roundTripsInTurns(
+                                blocks, [&] { return lookUpAfter(byCaller); }, [&] { return lookUpAfter(byInstaller); })
+                                .blocks;
     return {figureOf(registering, "registration.unchanged", "registering unchanged entitlements, against a lookup", 1.3,
                      "the entitlement file is not written"),
             figureOf(admission, "registration.admission",

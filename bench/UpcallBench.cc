@@ -2,6 +2,7 @@
 // The round trip of one upcall for a process whose containers are there, against an echo of the same packets that looks
 // whether the containers exist; and what a thousand upcalls a second do to a client's lookups beside them.
 #include "Benchmarks.h"
+#include "RoundTripPairs.h"
 #include "ipc/Names.h"
 #include "platform/EntitlementKeys.h"
 #include "platform/linux/Names.h"
@@ -203,34 +204,10 @@ Figure measureRoundTrip(const Settings& settings) {
     const PacketEcho echo(place.path(), reply, paths, processor);
     Agent floorAgent(place.path(), echoName);
     const Pinned pinned(processor);
-    Pairs halves;
-    std::vector<double> all;
-    std::vector<double> floorAll;
-    for (int block = -1; block < blocks; ++block) {
-        const auto measured = roundTrips([&] { return agent.exchange(request); }, reply, requests);
-        const auto floor = roundTrips([&] { return floorAgent.exchange(request); }, reply, requests);
-        if (block < 0) // warms up
-            continue;
-        halves.measured.push_back(median(measured));
-        halves.floor.push_back(median(floor));
-        all.insert(all.end(), measured.begin(), measured.end());
-        floorAll.insert(floorAll.end(), floor.begin(), floor.end());
-    }
-    const double p99 = percentile(all, 0.99);
-    const double floorP99 = percentile(floorAll, 0.99);
-    return {.name = "upcall.p50",
-            .what = "upcall round trip, one data and two group containers, p50",
-            .measured = text("%.2f us", halves.measuredMedian()),
-            .floor = text("%.2f us", halves.floorMedian()),
-            .value = halves.ratio(),
-            .unit = "x",
-            .goal = 2.5,
-            .remark = text("p99 %.2f us, of the floor %.2f us; request %zu bytes, reply %zu", p99, floorP99,
-                           request.size(), reply.size()),
-            .numbers = {{"p50us", halves.measuredMedian()},
-                        {"p99us", p99},
-                        {"floorP50us", halves.floorMedian()},
-                        {"floorP99us", floorP99}}};
+    return roundTripsInTurns(
+               blocks, [&] { return roundTrips([&] { return agent.exchange(request); }, reply, requests); },
+               [&] { return roundTrips([&] { return floorAgent.exchange(request); }, reply, requests); })
+        .figure("upcall.p50", "upcall round trip, one data and two group containers, p50", 2.5, request, reply);
 }
 
 /// Upcalls at a steady rate on a thread of its own, while it is told to.
