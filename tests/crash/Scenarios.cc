@@ -29,19 +29,26 @@ void makeLeftover(Device& device, const std::string& parent, const char* name) {
         throw std::runtime_error("no leftover");
 }
 
-/// Groups that no identifier is entitled to go at the next boot.
-void entitleToGroups(Device& device, const std::vector<Request>& requests) {
+/// Shared and system containers that no identifier is entitled to go at the next boot.
+void entitle(Device& device, const std::vector<Request>& requests) {
     plist::Array appGroups;
     plist::Array systemGroups;
+    std::vector<plist::Dictionary> values;
+    std::vector<std::string> identifiers;
     for (const Request& request : requests) {
+        if (request.containerClass == ContainerClass::dataSystem) {
+            values.push_back({{std::string(entitlementKeys::systemContainer), true}});
+            identifiers.push_back(request.identifier);
+        }
         if (request.containerClass == ContainerClass::sharedAppGroup)
             appGroups.emplace_back(request.identifier);
         if (request.containerClass == ContainerClass::sharedSystemGroup)
             systemGroups.emplace_back(request.identifier);
     }
-    const plist::Dictionary value{{std::string(entitlementKeys::applicationGroups), std::move(appGroups)},
-                                  {std::string(entitlementKeys::systemGroups), std::move(systemGroups)}};
-    if (!device.daemon->composition().entitlements()._setEntitlementDictionaryValues({value}, {"com.example.groups"}))
+    values.push_back({{std::string(entitlementKeys::applicationGroups), std::move(appGroups)},
+                      {std::string(entitlementKeys::systemGroups), std::move(systemGroups)}});
+    identifiers.emplace_back("com.example.groups");
+    if (!device.daemon->composition().entitlements()._setEntitlementDictionaryValues(values, identifiers))
         throw std::runtime_error("no entitlements");
 }
 
@@ -50,7 +57,7 @@ Scenario creation(const std::string& name, ContainerClass containerClass, std::u
     const Request request{identifier, containerClass, user};
     const auto prepare = [request](Device& device) {
         device.create({"com.example.first", ContainerClass::dataApplication, mobileUser});
-        entitleToGroups(device, {request});
+        entitle(device, {request});
     };
     return {.name = name,
             .prepare = prepare,
@@ -216,7 +223,7 @@ void makeUpcall(Device& device) {
 
 Scenario upcallOfSix() {
     Scenario scenario = creation("upcall that creates six containers", ContainerClass::dataApplication, mobileUser);
-    scenario.prepare = [](Device& device) { entitleToGroups(device, upcallRequests()); };
+    scenario.prepare = [](Device& device) { entitle(device, upcallRequests()); };
     scenario.act = makeUpcall;
     scenario.requests = upcallRequests();
     return scenario;
