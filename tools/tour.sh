@@ -132,13 +132,13 @@ lifecycle() {
 
 # A stricter class for files of an application, asked for while the device is locked.
 protection() {
-    local answered="$root/tmp/answered"
+    local answered="$root/tmp/answered" asking try
     say "The device is locked, and an installer asks for a stricter data-protection class: no answer yet."
     echo "secret" >"$notes/Documents/secret.txt"
     ctl lock-state 1
     echo '$ zorvanectl protect org.example.notes 1 --class data-app --user 501 &'
     "$binaries/zorvanectl" --root "$root" protect org.example.notes 1 --class data-app --user 501 >"$answered" &
-    local asking=$!
+    asking=$!
     for ((try = 0; try < 100; ++try)); do
         ctl protection org.example.notes --class data-app --user 501 >/dev/null
         [[ "$answer" == *pending* ]] && break
@@ -154,8 +154,8 @@ protection() {
     [[ "$answer" == *"recorded   1"* ]] || fail "the class is not recorded"
 }
 
-# A boot: what was meant to last until then goes.
-reboot() {
+# A boot: what was meant to last until then goes. Not named after the command that does it to the machine.
+nextBoot() {
     say "The device reboots. What was transient goes, and so does data that is nobody's."
     mkdir "$root/private/var/mobile/Containers/Data/Application/Junk"
     kill -KILL "$daemon"
@@ -238,7 +238,7 @@ ctl empty-death-row
 
 lifecycle
 protection
-reboot
+nextBoot
 
 if [[ -n "$(whyNoSandbox)" ]]; then
     say "Here two applications would run in sandboxes. This part is left out: $(whyNoSandbox)."

@@ -64,7 +64,8 @@ void Status::addEntitlements(plist::Dictionary& status) {
 void Status::addProtection(plist::Dictionary& counters) {
     plist::Array pending;
     for (const auto& change : composition_.store().dataProtection.pending())
-        pending.emplace_back(plist::Dictionary{{"Identifier", change.identifier},
+        pending.emplace_back(plist::Dictionary{{"UUID", change.uuid.string()},
+                                               {"Identifier", change.identifier},
                                                {"UserID", change.userId},
                                                {"ContainerClass", static_cast<std::uint64_t>(change.containerClass)},
                                                {"ProtectionClass", change.dataProtectionClass}});

@@ -33,7 +33,7 @@ int recordedClass(const ZORMetadata& container) {
     return static_cast<int>(value->asSigned().value_or(platform::defaultProtectionClass));
 }
 
-/// Files are changed where the new class is stricter; else only what is made in future is, by its directory's class.
+/// Files are changed where the new class is stricter; else directories alone are.
 std::int32_t changeType(int current, int requested) {
     const bool stricter = current > requested || (current == 0 && requested <= 2);
     return stricter ? protectionChange::directories | protectionChange::files | protectionChange::keepLower
@@ -49,7 +49,8 @@ struct ZORDataProtectionManager::Change {
         : manager(itsManager), request(std::move(itsRequest)), container(std::move(itsContainer)),
           completion(std::move(itsCompletion)) {
         const MutexLock lock(manager.mutex_);
-        pending = manager.pending_.insert(manager.pending_.end(), {.userId = request.userId,
+        pending = manager.pending_.insert(manager.pending_.end(), {.uuid = container->uuid(),
+                                                                   .userId = request.userId,
                                                                    .identifier = container->identifier(),
                                                                    .containerClass = request.containerClass,
                                                                    .dataProtectionClass = request.dataProtectionClass});

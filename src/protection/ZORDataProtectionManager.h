@@ -9,6 +9,7 @@
 #include "daemon/base/ContainerClass.h"
 #include "daemon/base/ErrorCode.h"
 #include "daemon/base/Result.h"
+#include "daemon/base/UUID.h"
 #include "platform/Mutex.h"
 
 #include <cstdint>
@@ -47,6 +48,7 @@ public:
 
     /// A change that has begun and not ended.
     struct Pending {
+        UUID uuid;
         std::uint32_t userId = 0;
         std::string identifier;
         ContainerClass containerClass = ContainerClass::undefined;

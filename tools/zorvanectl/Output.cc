@@ -62,6 +62,19 @@ std::string shown(const zorvane::Value& value) {
     return dumped(toJson(value), -1);
 }
 
+bool holdsMaps(const zorvane::List& list) {
+    return !list.empty() && std::ranges::all_of(list, [](const zorvane::Value& element) {
+        return std::holds_alternative<zorvane::Map>(element.content);
+    });
+}
+
+std::string onOneLine(const zorvane::Map& map) {
+    std::string text;
+    for (const auto& [key, element] : map)
+        text += (text.empty() ? "" : ", ") + printable(key) + " " + shown(element);
+    return text;
+}
+
 } // namespace
 
 void Output::json(const nlohmann::json& document) const {
@@ -90,6 +103,12 @@ void Output::table(const std::vector<std::string>& header, const std::vector<std
 }
 
 void Output::tree(const std::string& name, const zorvane::Value& value, const std::string& indent) const {
+    if (const auto* list = std::get_if<zorvane::List>(&value.content); list && holdsMaps(*list)) {
+        line(indent + printable(name) + ":");
+        for (const zorvane::Value& element : *list)
+            line(indent + "  " + onOneLine(std::get<zorvane::Map>(element.content)));
+        return;
+    }
     const auto* map = std::get_if<zorvane::Map>(&value.content);
     if (!map) {
         line(indent + printable(name) + ": " + shown(value));

@@ -3,12 +3,13 @@
 #include "Commands.h"
 #include "KnownContainer.h"
 #include "platform/FileDescriptor.h"
+#include "platform/linux/FileDeviceLockState.h"
 #include "platform/linux/Names.h"
 #include "platform/linux/Openat2.h"
+#include "platform/linux/SystemRoot.h"
+#include "platform/linux/XattrProtectionClass.h"
 
-#include <algorithm>
 #include <cerrno>
-#include <charconv>
 #include <cstdio>
 #include <cstring>
 #include <dirent.h>
@@ -16,33 +17,34 @@
 #include <map>
 #include <memory>
 #include <sys/stat.h>
-#include <sys/xattr.h>
 #include <unistd.h>
 
 namespace zorvanectl {
 
 namespace names = zor::platform::names;
+using zor::platform::defaultProtectionClass;
 using zor::platform::FileDescriptor;
+using zor::platform::FileDeviceLockState;
 using zor::platform::openBeneath;
+using zor::platform::SystemRoot;
+using zor::platform::XattrProtectionClass;
 
 namespace {
 
 /// How long an answer may take before it counts as one that comes after the next unlock.
 constexpr std::uint32_t pendingAfterMilliseconds = 1000;
-constexpr int classOfNone = 3;
-constexpr const char* pendingKey = "PendingProtectionChanges";
+constexpr int lockStateLocked = 1;
 
-/// A class, or why it cannot be told.
+/// A class, or why it cannot be told. The daemon keeps it where a file's owner cannot change it, if it can.
 std::string classOnDisk(int directory) {
     for (const char* attribute : {names::protectionAttribute, names::protectionAttributeUser}) {
-        char text[16];
-        const ssize_t bytes = ::fgetxattr(directory, attribute, text, sizeof text);
-        if (bytes > 0)
-            return {text, static_cast<std::size_t>(bytes)};
-        if (bytes < 0 && errno != ENODATA && errno != EOPNOTSUPP)
-            return ::strerrordesc_np(errno);
+        const auto found = XattrProtectionClass::classIn(directory, attribute);
+        if (!found)
+            return ::strerrordesc_np(found.error());
+        if (*found)
+            return std::to_string(**found);
     }
-    return std::to_string(classOfNone);
+    return std::to_string(defaultProtectionClass);
 }
 
 /// Of each directory that lies in the container.
@@ -59,35 +61,36 @@ std::map<std::string, std::string> classesOnDisk(const std::string& path) {
         return classes;
     }
     while (const dirent* entry = ::readdir(entries.get())) {
-        const auto item = openBeneath(fd, entry->d_name, O_RDONLY | O_DIRECTORY);
-        if (entry->d_name[0] != '.' && item)
+        if (entry->d_name[0] == '.')
+            continue;
+        if (const auto item = openBeneath(fd, entry->d_name, O_RDONLY | O_DIRECTORY))
             classes.emplace(entry->d_name, classOnDisk(item->get()));
     }
     return classes;
 }
 
-/// The class that is asked for in a change that has not ended.
-std::optional<std::int64_t> pendingClass(const zorvane::ConnectOptions& connect,
-                                         const zorvane::Client::Address& address) {
+/// A change that has not ended, as the status tells it.
+struct Pending {
+    std::int64_t protectionClass = 0;
+    bool locked = false;
+};
+std::optional<Pending> pendingChange(const zorvane::ConnectOptions& connect, const zorvane::Client::Address& address) {
     const auto answer = zorvane::status(connect);
-    if (!answer)
-        return std::nullopt;
-    const nlohmann::json status = toJson(*answer);
-    const auto counters = status.find("Counters");
-    if (counters == status.end() || !counters->contains(pendingKey))
-        return std::nullopt;
-    for (const auto& change : counters->at(pendingKey))
-        if (change.value("Identifier", "") == address.identifier && change.value("UserID", 0U) == address.user &&
-            change.value("ContainerClass", std::uint64_t{0}) == address.containerClass)
-            return change.value("ProtectionClass", std::int64_t{0});
+    const nlohmann::json status = answer ? toJson(*answer) : nlohmann::json::object();
+    const nlohmann::json counters = status.value("Counters", nlohmann::json::object());
+    for (const auto& change : counters.value("PendingProtectionChanges", nlohmann::json::array()))
+        if (change.value("UUID", "") == zorvane::uuidText(address.uuid))
+            return Pending{.protectionClass = change.value("ProtectionClass", std::int64_t{0}),
+                           .locked = counters.value("LockState", 0) == lockStateLocked};
     return std::nullopt;
 }
 
 int showProtection(const Output& output, const zorvane::Client::Address& address, std::int64_t recorded,
-                   const std::map<std::string, std::string>& onDisk, std::optional<std::int64_t> pending) {
+                   const std::map<std::string, std::string>& onDisk, const std::optional<Pending>& pending) {
     if (output.isJson()) {
         nlohmann::json json = {{"identifier", address.identifier}, {"recorded", recorded}, {"onDisk", onDisk}};
-        json["pending"] = pending ? nlohmann::json(*pending) : nlohmann::json();
+        json["pending"] = pending ? nlohmann::json(pending->protectionClass) : nlohmann::json();
+        json["waitsForUnlock"] = pending && pending->locked;
         output.json(json);
         return exitDone;
     }
@@ -96,20 +99,15 @@ int showProtection(const Output& output, const zorvane::Client::Address& address
     for (const auto& [name, text] : onDisk)
         output.line("  on disk    " + text + "  " + printable(name));
     if (pending)
-        output.line("  pending    " + std::to_string(*pending) + ", waiting for the device to be unlocked");
+        output.line("  pending    " + std::to_string(pending->protectionClass) +
+                    (pending->locked ? ", waiting for the device to be unlocked" : ", being made"));
     return exitDone;
 }
 
-std::optional<int> integerIn(const std::string& text) {
-    int number = 0;
-    const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), number);
-    return error == std::errc() && end == text.data() + text.size() ? std::optional(number) : std::nullopt;
-}
-
-int failed(const std::string& what, int number, const char* advice) {
-    std::fprintf(stderr, "zorvanectl: %s: %s\n  What to do: %s\n", printable(what).c_str(), ::strerrordesc_np(number),
-                 advice);
-    return exitUnreachable;
+zorvane::Error unreachable(const std::string& what, int number) {
+    return {.kind = zorvane::Error::Kind::unreachable,
+            .code = 0,
+            .message = printable(what) + ": " + ::strerrordesc_np(number)};
 }
 
 /// 0 or an errno. By rename, so that nobody reads half a state.
@@ -121,8 +119,11 @@ int writeLockState(int directory, int state) {
         ::openat(directory, temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0644));
     if (!file.valid())
         return errno;
-    if (::write(file.get(), text.data(), text.size()) != static_cast<ssize_t>(text.size()) ||
-        ::fchmod(file.get(), 0644) != 0 || ::renameat(directory, temporary.c_str(), directory, names::lockState) != 0)
+    const ssize_t written = ::write(file.get(), text.data(), text.size());
+    if (written >= 0 && written < static_cast<ssize_t>(text.size()))
+        return ENOSPC;
+    if (written < 0 || ::fchmod(file.get(), 0644) != 0 ||
+        ::renameat(directory, temporary.c_str(), directory, names::lockState) != 0)
         return errno;
     return 0;
 }
@@ -172,41 +173,34 @@ int protection(const zorvane::ConnectOptions& connect, const Output& output, con
             const auto found = metadata->info.find(std::string(zorvane::protectionClassInfoKey()));
             const auto* number =
                 found == metadata->info.end() ? nullptr : std::get_if<std::int64_t>(&found->second.content);
-            return showProtection(output, address, number ? *number : classOfNone, classesOnDisk(metadata->path),
-                                  pendingClass(connect, address));
+            return showProtection(output, address, number ? *number : defaultProtectionClass,
+                                  classesOnDisk(metadata->path), pendingChange(connect, address));
         });
 }
 
 int lockState(const zorvane::ConnectOptions& connect, const Output& output, const std::optional<int>& state) {
-    const FileDescriptor root(::open(connect.root.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-    struct stat device{};
-    struct stat given{};
-    const bool isDevice = ::stat("/", &device) == 0 && root.valid() && ::fstat(root.get(), &given) == 0 &&
-                          device.st_dev == given.st_dev && device.st_ino == given.st_ino;
-    if (state && isDevice) {
+    const std::string what = state ? "set the lock state" : "show the lock state";
+    auto root = SystemRoot::open(connect.root);
+    if (!root)
+        return output.error(unreachable("the root " + connect.root + " cannot be opened", root.error()), what);
+    if (state && root->isDeviceRoot()) {
         std::fputs("zorvanectl: the lock state of a device is the device's to set; name another root with --root\n",
                    stderr);
         return exitUsage;
     }
-    const auto directory = openBeneath(root.get(), names::runtimeDirectory, O_RDONLY | O_DIRECTORY);
-    if (!directory)
-        return failed("cannot open " + connect.root + "/" + names::runtimeDirectory, directory.error(),
-                      "start the daemon, or name its root with --root");
+    const std::string directory = root->path(names::runtimeDirectory);
+    if (const int failure = root->openRuntimeDirectory())
+        return output.error(unreachable(directory + " cannot be opened", failure), what);
     if (state)
-        if (const int failure = writeLockState(directory->get(), *state))
-            return failed("cannot write the lock state", failure, "do it as the owner of the daemon's root");
-    char text[32] = {};
-    const auto file = openBeneath(directory->get(), names::lockState, O_RDONLY | O_NONBLOCK);
-    if (!file && file.error() != ENOENT)
-        return failed("cannot read the lock state", file.error(), "see what lies there");
-    const ssize_t bytes = file ? ::read(file->get(), text, sizeof text - 1) : 0;
-    std::string shown(text, bytes > 0 ? static_cast<std::size_t>(bytes) : 0);
-    std::erase(shown, '\n');
-    const int now = shown.empty() ? 0 : integerIn(shown).value_or(-1);
+        if (const int failure = writeLockState(root->runtimeDirectory(), *state))
+            return output.error(unreachable(directory + " cannot be written to", failure), what);
+    const int now = FileDeviceLockState(*root).currentState();
     if (output.isJson())
-        output.json({{"lockState", now}, {"locked", now == 1}});
+        output.json({{"lockState", now}, {"locked", now == lockStateLocked}});
     else
-        output.line(now == 0 ? "unlocked" : now == 1 ? "locked" : "state " + std::to_string(now));
+        output.line(now == 0                 ? "unlocked"
+                    : now == lockStateLocked ? "locked"
+                                             : "neither locked nor unlocked (" + std::to_string(now) + ")");
     return exitDone;
 }
 

@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// zorvanectl: the command line of the container manager. Everything it does goes through the public client library.
+// zorvanectl: the command line of the container manager. What it asks of the daemon goes through
+// the public client library.
 #include "Commands.h"
 #include "Output.h"
 
@@ -75,16 +76,22 @@ Consent consentOf(const Arguments& arguments) {
 
 /// What the command line asks for, to be done once it is parsed as a whole.
 using Action = std::function<int(const Output&)>;
+using Run = int (*)(const Arguments&, const Output&);
+
+CLI::App* addCommand(CLI::App& above, Arguments& arguments, Action& action, const char* name, const char* help,
+                     Run run) {
+    CLI::App* command = above.add_subcommand(name, help);
+    command->callback([&arguments, &action, command, run] {
+        if (command->get_option_no_throw("--class"))
+            finishTarget(*command, arguments);
+        action = [&arguments, run](const Output& output) { return run(arguments, output); };
+    });
+    return command;
+}
 
 void addContainerCommands(CLI::App& app, Arguments& arguments, Action& action) {
-    const auto make = [&](const char* name, const char* help, auto&& run) {
-        CLI::App* command = app.add_subcommand(name, help);
-        command->callback([&arguments, &action, command, run] {
-            if (command->get_option_no_throw("--class"))
-                finishTarget(*command, arguments);
-            action = [&arguments, run](const Output& output) { return run(arguments, output); };
-        });
-        return command;
+    const auto make = [&](const char* name, const char* help, Run run) {
+        return addCommand(app, arguments, action, name, help, run);
     };
     CLI::App* create =
         make("create", "Make a container, or find the one that is there",
@@ -114,16 +121,11 @@ void addContainerCommands(CLI::App& app, Arguments& arguments, Action& action) {
 }
 
 void addKnownContainerCommands(CLI::App& app, Arguments& arguments, Action& action) {
-    using Run = int (*)(const Arguments&, const Output&);
     const auto make = [&](CLI::App& above, const char* name, const char* help, Run run,
                           bool identifierRequired = true) {
-        CLI::App* command = above.add_subcommand(name, help);
+        CLI::App* command = addCommand(above, arguments, action, name, help, run);
         command->add_option("identifier", arguments.target.identifier, "Identifier")->required(identifierRequired);
         addTargetOptions(*command, arguments);
-        command->callback([&arguments, &action, command, run] {
-            finishTarget(*command, arguments);
-            action = [&arguments, run](const Output& output) { return run(arguments, output); };
-        });
         return command;
     };
     CLI::App* replace = make(
@@ -164,14 +166,8 @@ void addKnownContainerCommands(CLI::App& app, Arguments& arguments, Action& acti
 
 void addProtectionCommands(CLI::App& app, Arguments& arguments, Action& action) {
     Protection& protection = arguments.protection;
-    const auto make = [&](const char* name, const char* help, auto&& run) {
-        CLI::App* command = app.add_subcommand(name, help);
-        command->callback([&arguments, &action, command, run] {
-            if (command->get_option_no_throw("--class"))
-                finishTarget(*command, arguments);
-            action = [&arguments, run](const Output& output) { return run(arguments, output); };
-        });
-        return command;
+    const auto make = [&](const char* name, const char* help, Run run) {
+        return addCommand(app, arguments, action, name, help, run);
     };
     CLI::App* protect = make(
         "protect", "Change the data-protection class of a container; waits for an unlock",
@@ -201,12 +197,9 @@ void addEntitlementCommands(CLI::App& app, Arguments& arguments, Action& action)
     Registration& registration = arguments.registration;
     CLI::App* entitlements = app.add_subcommand("entitlements", "What an identifier is entitled to");
     entitlements->require_subcommand(1);
-    const auto make = [&](const char* name, const char* help, auto&& run) {
-        CLI::App* command = entitlements->add_subcommand(name, help);
+    const auto make = [&](const char* name, const char* help, Run run) {
+        CLI::App* command = addCommand(*entitlements, arguments, action, name, help, run);
         command->add_option("identifier", registration.identifier, "Identifier")->required();
-        command->callback([&arguments, &action, run] {
-            action = [&arguments, run](const Output& output) { return run(arguments, output); };
-        });
         return command;
     };
     CLI::App* set =
@@ -230,12 +223,8 @@ void addEntitlementCommands(CLI::App& app, Arguments& arguments, Action& action)
 }
 
 void addGroupCommands(CLI::App& app, Arguments& arguments, Action& action) {
-    const auto make = [&](const char* name, const char* help, auto&& run) {
-        CLI::App* command = app.add_subcommand(name, help);
-        command->callback([&arguments, &action, run] {
-            action = [&arguments, run](const Output& output) { return run(arguments, output); };
-        });
-        return command;
+    const auto make = [&](const char* name, const char* help, Run run) {
+        return addCommand(app, arguments, action, name, help, run);
     };
     const char* ownByDefault = "Identifier; without it, this program's own";
     CLI::App* groups = make("groups", "Paths of an identifier's group containers, made where they are missing",

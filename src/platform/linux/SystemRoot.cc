@@ -59,14 +59,21 @@ int SystemRoot::makeRuntimeDirectory(Disk& disk) {
     if (!parent)
         return parent.error();
     auto directory = makeAndOpen(disk, parent->get(), names::runtimeName);
-    if (!directory)
-        return directory.error();
+    return directory ? adoptRuntimeDirectory(std::move(*directory)) : directory.error();
+}
+
+int SystemRoot::openRuntimeDirectory() {
+    auto directory = openBeneath(directory_.get(), names::runtimeDirectory, O_RDONLY | O_DIRECTORY);
+    return directory ? adoptRuntimeDirectory(std::move(*directory)) : directory.error();
+}
+
+int SystemRoot::adoptRuntimeDirectory(FileDescriptor directory) {
     struct stat status{};
-    if (::fstat(directory->get(), &status) != 0)
+    if (::fstat(directory.get(), &status) != 0)
         return errno;
     if ((status.st_uid != 0 && status.st_uid != ::geteuid()) || (status.st_mode & (S_IWGRP | S_IWOTH)) != 0)
         return EPERM;
-    runtimeDirectory_ = std::move(*directory);
+    runtimeDirectory_ = std::move(directory);
     return 0;
 }
 

@@ -2,7 +2,7 @@
 // The directory below which everything of the system lies: "/" on a device, any directory elsewhere.
 //
 // The path is made canonical once, at the start, and the directory is held open, so that what the daemon calls its root
-// cannot change under it. Immutable after makeRuntimeDirectory; any thread.
+// cannot change under it. Immutable after the runtime directory was made or opened; any thread.
 #pragma once
 
 #include "platform/Disk.h"
@@ -30,11 +30,15 @@ public:
     /// Makes run/zorvane (0755) where it is missing and opens it. 0 or an errno: EPERM when the directory belongs to
     /// somebody else or others can write to it. Called once, before any thread.
     int makeRuntimeDirectory(Disk& disk);
-    /// run/zorvane, a real descriptor; -1 until it was made.
+    /// Opens run/zorvane as it is, with the same judgement: for programs that look at what a daemon left there.
+    int openRuntimeDirectory();
+    /// run/zorvane, a real descriptor; -1 until it was made or opened.
     [[nodiscard]] int runtimeDirectory() const { return runtimeDirectory_.get(); }
 
 private:
     SystemRoot() = default;
+    int adoptRuntimeDirectory(FileDescriptor directory);
+
     std::string canonicalPath_;
     FileDescriptor directory_;
     FileDescriptor runtimeDirectory_;

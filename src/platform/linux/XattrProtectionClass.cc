@@ -35,11 +35,19 @@ XattrProtectionClass::XattrProtectionClass(const SystemRoot& root, Disk& disk, c
     : attribute_(chooseAttribute(root)), disk_(disk), lockState_(lockState) {}
 
 std::expected<int, int> XattrProtectionClass::classOf(int fd) const {
+    const auto found = classIn(fd, attribute_);
+    if (!found)
+        return std::unexpected(found.error());
+    return found->value_or(defaultProtectionClass);
+}
+
+std::expected<std::optional<int>, int> XattrProtectionClass::classIn(int fd, const char* attribute) {
     char text[16];
-    const ssize_t bytes = ::fgetxattr(fd, attribute_, text, sizeof text);
+    const ssize_t bytes = ::fgetxattr(fd, attribute, text, sizeof text);
     if (bytes < 0) {
-        // A longer value is no number of ours either.
-        if (errno == ENODATA || errno == EOPNOTSUPP || errno == ERANGE)
+        if (errno == ENODATA || errno == EOPNOTSUPP)
+            return std::nullopt;
+        if (errno == ERANGE) // a longer value is no number of ours
             return defaultProtectionClass;
         return std::unexpected(errno == EPERM ? EACCES : errno);
     }

@@ -12,6 +12,7 @@
 #include "platform/linux/SystemRoot.h"
 
 #include <atomic>
+#include <optional>
 
 namespace zor::platform {
 
@@ -20,6 +21,10 @@ public:
     /// Looks once, on the root's runtime directory, whether this process may set attributes that clients cannot: else
     /// the attribute is one that a file's owner can forge.
     XattrProtectionClass(const SystemRoot& root, Disk& disk, const DeviceLockState& lockState);
+
+    /// What an attribute of an open file says; nullopt when it has none (or its file system has none at all). A value
+    /// that is no class of ours reads as the default. Else an errno.
+    [[nodiscard]] static std::expected<std::optional<int>, int> classIn(int fd, const char* attribute);
 
     [[nodiscard]] std::expected<int, int> classOf(int fd) const override;
     /// EINVAL for a negative class.
