@@ -3,7 +3,7 @@
 set(CMAKE_CXX_STANDARD 23)
 set(CMAKE_CXX_STANDARD_REQUIRED ON)
 set(CMAKE_CXX_EXTENSIONS OFF)
-set(CMAKE_EXPORT_COMPILE_COMMANDS ON)
+option(CMAKE_EXPORT_COMPILE_COMMANDS "What editors and clang tools read" ON)
 set(CMAKE_RUNTIME_OUTPUT_DIRECTORY ${CMAKE_BINARY_DIR}/bin)
 
 add_library(zor_options INTERFACE)
@@ -27,28 +27,19 @@ target_include_directories(zor_options INTERFACE ${CMAKE_SOURCE_DIR}/src)
 set(CMAKE_POSITION_INDEPENDENT_CODE OFF)
 target_compile_options(zor_options INTERFACE -fPIC)
 
-# Half of a translation unit's time went into the standard library's headers. Every source that is installed still includes what
-# it uses: where clang-tidy looks at it, it goes without.
+# Half of a translation unit's time went into the standard library's headers. Every source still includes what it uses: clang-tidy
+# looks at all of them without.
 option(ZORVANE_PCH "Precompile the standard headers" ON)
 if(ZORVANE_PCH)
     file(CONFIGURE OUTPUT ${CMAKE_BINARY_DIR}/pch.cc CONTENT "")
     add_library(zor_pch STATIC ${CMAKE_BINARY_DIR}/pch.cc)
-    set_target_properties(zor_pch PROPERTIES CXX_CLANG_TIDY "")
     target_link_libraries(zor_pch PRIVATE zor_options)
     target_precompile_headers(zor_pch PRIVATE <algorithm> <atomic> <condition_variable> <deque> <expected> <functional>
         <map> <memory> <mutex> <optional> <set> <span> <string> <string_view> <thread> <unordered_set> <variant> <vector>)
 endif()
 function(zor_use_pch target)
-    get_target_property(tidy ${target} CXX_CLANG_TIDY)
-    if(ZORVANE_PCH AND NOT tidy)
+    if(ZORVANE_PCH)
         target_precompile_headers(${target} REUSE_FROM zor_pch)
-    endif()
-endfunction()
-
-# A changed list of checks judges every source anew.
-function(zor_depend_on_tidy sources)
-    if(ZORVANE_TIDY)
-        set_property(SOURCE ${sources} APPEND PROPERTY OBJECT_DEPENDS ${CMAKE_SOURCE_DIR}/.clang-tidy)
     endif()
 endfunction()
 
@@ -72,7 +63,6 @@ function(zor_library name)
     endif()
     add_library(zor_${name} STATIC ${sources})
     zor_use_pch(zor_${name})
-    zor_depend_on_tidy("${sources}")
     target_link_libraries(zor_${name} PUBLIC zor_options)
     target_link_libraries(zor_${name} ${ARG_LINK})
     foreach(dir IN LISTS ARG_INCLUDE)
@@ -107,7 +97,6 @@ function(zor_program name)
     endif()
     add_executable(${name} ${sources})
     zor_use_pch(${name})
-    zor_depend_on_tidy("${sources}")
     target_link_libraries(${name} PRIVATE zor_options ${ARG_LINK})
     # What is installed carries its C++ runtime; a sanitizer has to see the shared one.
     target_link_options(${name} PRIVATE -Wl,-z,relro,-z,now $<$<CONFIG:Release>:-static-libstdc++;-static-libgcc>)

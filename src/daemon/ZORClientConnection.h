@@ -224,7 +224,7 @@ private:
     void recoverFromException(const ReplaceProgress& progress);
     std::optional<ZORError> cleanUpReplace(const ReplaceProgress& progress, StartDeletionThread startDeletionThread);
     Result<void> recoverReplace(const FileURL& journalUrl);
-    Result<void> moveBack(const ReplaceJournal& journal, const FileURL& journalUrl);
+    Result<void> applyReplaceJournal(const ReplaceJournal& journal);
 
     Result<std::shared_ptr<ZORMetadata>> knownContainer(const char* function, const ContainerAddress& address);
     Result<void> checkAddress(const char* function, const ContainerAddress& address);

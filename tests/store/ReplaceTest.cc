@@ -283,13 +283,14 @@ TEST_F(Replace, EveryStateOfTheTableIsRecovered) {
     const std::array<std::string, 4> paths = {old, fresh, waiting, dest};
     const std::array<std::string, 4> preserving = {old, fresh, waiting, old};
     const Row rows[] = {
-        {"not yet moved", {old, fresh}, paths, {{old, old}, {fresh, fresh}}, ""},
-        {"old moved", {waiting, fresh}, paths, {{old, waiting}, {fresh, fresh}}, ""},
-        {"old moved, preserving", {waiting, fresh}, preserving, {{old, waiting}, {fresh, fresh}}, ""},
-        {"both moved", {waiting, dest}, paths, {{dest, dest}}, ""},
-        {"both moved, preserving", {waiting, old}, preserving, {{old, old}}, ""},
-        {"staging gone", {dest}, paths, {{dest, dest}}, ""},
-        {"nothing left", {}, paths, {}, "Nothing is left"},
+        {"not yet moved", {old, fresh}, paths, {{old, old}, {fresh, fresh}}, ": nothing had moved"},
+        {"old moved", {waiting, fresh}, paths, {{old, waiting}, {fresh, fresh}}, ": the old one had moved"},
+        {"old moved, preserving", {waiting, fresh}, preserving, {{old, waiting}, {fresh, fresh}}, ": the old one had"},
+        {"both moved", {waiting, dest}, paths, {{dest, dest}}, ": both had moved"},
+        {"both moved, preserving", {waiting, old}, preserving, {{old, old}}, ": both had moved"},
+        {"staging gone", {dest}, paths, {{dest, dest}}, ": nothing was waiting any more"},
+        {"staging gone, preserving", {old}, preserving, {{old, old}}, ": nothing was waiting any more"},
+        {"nothing left", {}, paths, {}, ": nothing is left"},
         {"a path missing", {waiting, fresh}, {old, "", waiting, dest}, {{fresh, fresh}}, "Invalid replace data"},
     };
     for (const Row& row : rows) {
@@ -309,9 +310,9 @@ TEST_F(Replace, EveryStateOfTheTableIsRecovered) {
             }
         }
         EXPECT_TRUE(nothingIsUnderWay());
-        bool said = row.said[0] == '\0';
+        bool said = false;
         for (const support::LogLine& line : world.log.take())
-            said = said || (line.level == 3 && line.message.find(row.said) != std::string::npos);
+            said = said || (line.level <= 5 && line.message.find(row.said) != std::string::npos);
         EXPECT_TRUE(said);
         for (const std::string& place : {old, fresh, dest})
             (void)world.daemonsClient()._moveItemAtURLToDeathRow(world.url(place), StartDeletionThread::no);

@@ -1,18 +1,13 @@
 // SPDX-License-Identifier: Apache-2.0
 // Putting a new container in the place of an old one.
 //
-// The one change of the store that takes more than one move, so it has a journal. What a stop leaves, and what the next
-// launch makes of it:
-//
-//   stopped after                      | on the disk                              | recovery
-//   -----------------------------------|------------------------------------------|----------------------------------
-//   the new one got the old UUID       | both in place                            | none; a transient one is discarded
-//   the journal was half written       | the same, and a hidden file              | the file goes
-//   the journal was written            | journal, both in place                   | journal goes; nothing has happened
-//   the old one moved to staging       | journal, old and destination missing     | old moves back; nothing has
-//   happened the new one moved into place       | journal, destination there, old waiting  | journal goes, staging is
-//   swept: done staging went to death row          | journal, destination there               | the same both went |
-//   destination there                        | none: done
+// The one change of the store that takes more than one move, so it has a journal; `ReplaceRecovery.cc` reads it. In
+// order:
+//   1. the new one's file gets the old UUID, where that is preserved   stopped: a transient one is discarded
+//   2. the journal is written                                          stopped: half a file goes; nothing has happened
+//   3. the old one moves to staging                                    stopped: it moves back; nothing has happened
+//   4. the new one moves to its destination                            stopped: done; staging is swept
+//   5. what waits in staging goes to death row, then the journal       stopped: done; the journal goes
 //
 // A power cut leaves the same states: the journal is synced before the first move, the moves keep their order (where
 // the file system does not see to that, syncs do), and they are on the disk before the journal goes and the client
@@ -45,7 +40,6 @@ struct ZORClientConnection::ReplaceProgress {
 namespace {
 
 constexpr const char* replaceFunction = "replaceContainer";
-constexpr const char* recoverFunction = "_recoverFromReplaceOperationsWithError";
 
 const std::string* pointerTo(const std::optional<std::string>& text) {
     return text ? &*text : nullptr;
@@ -323,69 +317,6 @@ std::optional<ZORError> ZORClientConnection::cleanUpReplace(const ReplaceProgres
         failed = makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
                            LogFlag::yes, "Failed to remove replace file: %s", progress.journalUrl.c_str());
     return failed;
-}
-
-Result<void> ZORClientConnection::_recoverFromReplaceOperationsWithError() {
-    const FileURL replace = services_.configuration.replaceDirectory();
-    const auto items = services_.fileManager.urlsForItemsInDirectoryAtURL(replace);
-    if (!items) {
-        if (!items.error().isPosix(ENOENT))
-            services_.log.write(logLevelError, recoverFunction, "Failed to get items at replace URL%s : %s",
-                                replace.c_str(), items.error().text().c_str());
-        return {};
-    }
-    // A journal has its name for itself alone, so no later write removes what a stop left of this one's.
-    for (const FileURL& leftover : services_.fileManager.writeLeftoversInDirectoryAtURL(replace))
-        (void)_moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
-    for (const FileURL& item : *items)
-        TRY(recoverReplace(item));
-    return {};
-}
-
-Result<void> ZORClientConnection::moveBack(const ReplaceJournal& journal, const FileURL& journalUrl) {
-    const Log& log = services_.log;
-    const Here here{recoverFunction, __LINE__};
-    ZORFileManager& fileManager = services_.fileManager;
-    const auto failed = [&](const ZORError* cause) {
-        return makeError(log, here, ErrorCode::journalUnusable, cause, LogFlag::yes,
-                         "Failed to recover replace move: %s to %s", journal.stagingUrl.c_str(),
-                         journal.oldUrl.c_str());
-    };
-    // What cannot be examined may be there or not. The journal waits for a launch that can tell.
-    if (!fileManager.itemDoesNotExistAtURL(journal.oldUrl) || !fileManager.itemDoesNotExistAtURL(journal.destUrl))
-        return failed(nullptr);
-    if (fileManager.itemDoesNotExistAtURL(journal.stagingUrl)) {
-        log.write(logLevelError, recoverFunction, "Nothing is left of the replace of %s", journalUrl.c_str());
-        return {};
-    }
-    if (log.writes(logLevelDebug))
-        log.write(logLevelDebug, recoverFunction, "Recovering from failed replace by moving: %s to %s",
-                  journal.stagingUrl.c_str(), journal.oldUrl.c_str());
-    if (const auto moved = fileManager.moveItemAtURL(journal.stagingUrl, journal.oldUrl); !moved)
-        return failed(&moved.error());
-    // On the disk before the journal can be gone.
-    if (orderBetween(journal.oldUrl.deletingLastPathComponent(), services_.configuration.replaceDirectory()) < 0)
-        return failed(nullptr);
-    return {};
-}
-
-Result<void> ZORClientConnection::recoverReplace(const FileURL& journalUrl) {
-    const Log& log = services_.log;
-    const Here here{recoverFunction, __LINE__};
-    ZORFileManager& fileManager = services_.fileManager;
-    auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(log, fileManager, journalUrl);
-    if (journal) {
-        journal->moveToRoot(fileManager.resolver().root().canonicalPath(), services_.configuration.stagingDirectory());
-        if (log.writes(logLevelDebug))
-            log.write(logLevelDebug, recoverFunction, "Doing a replace of %s with info: %s", journalUrl.c_str(),
-                      journal->text().c_str());
-        if (!fileManager.itemExistsAtURL(journal->oldUrl) && !fileManager.itemExistsAtURL(journal->destUrl))
-            TRY(moveBack(*journal, journalUrl));
-    }
-    if (const auto moved = _moveItemAtURLToDeathRow(journalUrl, StartDeletionThread::no); !moved)
-        return makeError(log, here, ErrorCode::replaceCleanUpFailed, &moved.error(), LogFlag::yes,
-                         "Failed to remove replace file at %s", journalUrl.c_str());
-    return {};
 }
 
 } // namespace zor

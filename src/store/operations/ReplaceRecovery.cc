@@ -1,0 +1,135 @@
+// SPDX-License-Identifier: Apache-2.0
+// What a launch makes of the replaces that were under way when the last daemon ended.
+//
+// A journal says where the directories of a replace were and were to go; which of them are there says how far it came.
+// `states` is the table of that. Each row's recovery is one move at the most, on the disk before the journal can be
+// gone: a stop in between leaves another row of the table.
+//
+// Runs on the thread that starts the daemon, before any client and before anything is cached.
+#include "daemon/ZORClientConnection.h"
+#include "store/StoreServices.h"
+#include "store/operations/ReplaceJournal.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <iterator>
+
+namespace zor {
+
+namespace {
+
+constexpr const char* recoverFunction = "_recoverFromReplaceOperationsWithError";
+
+/// What lies in a place. What cannot be examined is unknown, and matches only where it does not matter.
+enum class Found : std::uint8_t { absent, present, unknown };
+enum class Expected : std::uint8_t { absent, present, anything };
+enum class Recovery : std::uint8_t { nothing, moveOldBack };
+
+struct State {
+    const char* label;
+    Expected old;
+    Expected destination;
+    Expected staging;
+    Recovery recovery;
+};
+/// The first row that matches holds. Where the new one is to take the old one's very place, that place counts as the
+/// destination.
+constexpr State states[] = {
+    {"nothing had moved", Expected::present, Expected::anything, Expected::anything, Recovery::nothing},
+    {"nothing was waiting any more", Expected::absent, Expected::present, Expected::absent, Recovery::nothing},
+    {"both had moved", Expected::absent, Expected::present, Expected::anything, Recovery::nothing},
+    {"nothing is left", Expected::absent, Expected::absent, Expected::absent, Recovery::nothing},
+    {"the old one had moved", Expected::absent, Expected::absent, Expected::anything, Recovery::moveOldBack},
+};
+
+bool matches(Expected expected, Found found) {
+    switch (expected) {
+    case Expected::absent:
+        return found == Found::absent;
+    case Expected::present:
+        return found == Found::present;
+    case Expected::anything:
+        break;
+    }
+    return true;
+}
+
+Found look(ZORFileManager& fileManager, const FileURL& url) {
+    if (fileManager.itemExistsAtURL(url))
+        return Found::present;
+    return fileManager.itemDoesNotExistAtURL(url) ? Found::absent : Found::unknown;
+}
+
+/// nullptr when what matters cannot be examined.
+const State* stateOf(ZORFileManager& fileManager, const ReplaceJournal& journal) {
+    const Found destination = look(fileManager, journal.destUrl);
+    const Found old = journal.oldUrl == journal.destUrl ? Found::absent : look(fileManager, journal.oldUrl);
+    const Found staging = look(fileManager, journal.stagingUrl);
+    const auto* const found = std::ranges::find_if(states, [&](const State& state) {
+        return matches(state.old, old) && matches(state.destination, destination) && matches(state.staging, staging);
+    });
+    return found == std::end(states) ? nullptr : found;
+}
+
+} // namespace
+
+Result<void> ZORClientConnection::_recoverFromReplaceOperationsWithError() {
+    const FileURL replace = services_.configuration.replaceDirectory();
+    const auto items = services_.fileManager.urlsForItemsInDirectoryAtURL(replace);
+    if (!items) {
+        if (!items.error().isPosix(ENOENT))
+            services_.log.write(logLevelError, recoverFunction, "Failed to get items at replace URL%s : %s",
+                                replace.c_str(), items.error().text().c_str());
+        return {};
+    }
+    // A journal has its name for itself alone, so no later write removes what a stop left of this one's.
+    for (const FileURL& leftover : services_.fileManager.writeLeftoversInDirectoryAtURL(replace))
+        (void)_moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
+    for (const FileURL& item : *items)
+        TRY(recoverReplace(item));
+    return {};
+}
+
+Result<void> ZORClientConnection::recoverReplace(const FileURL& journalUrl) {
+    const Log& log = services_.log;
+    ZORFileManager& fileManager = services_.fileManager;
+    auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(log, fileManager, journalUrl);
+    if (journal) {
+        journal->moveToRoot(fileManager.resolver().root().canonicalPath(), services_.configuration.stagingDirectory());
+        if (log.writes(logLevelDebug))
+            log.write(logLevelDebug, recoverFunction, "Doing a replace of %s with info: %s", journalUrl.c_str(),
+                      journal->text().c_str());
+        TRY(applyReplaceJournal(*journal));
+    }
+    if (const auto moved = _moveItemAtURLToDeathRow(journalUrl, StartDeletionThread::no); !moved)
+        return makeError(log, {recoverFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
+                         LogFlag::yes, "Failed to remove replace file at %s", journalUrl.c_str());
+    return {};
+}
+
+Result<void> ZORClientConnection::applyReplaceJournal(const ReplaceJournal& journal) {
+    const Log& log = services_.log;
+    const auto failed = [&](const ZORError* cause) {
+        return makeError(log, {recoverFunction, __LINE__}, ErrorCode::journalUnusable, cause, LogFlag::yes,
+                         "Failed to recover replace move: %s to %s", journal.stagingUrl.c_str(),
+                         journal.oldUrl.c_str());
+    };
+    // What cannot be examined may be there or not. The journal waits for a launch that can tell.
+    const State* const state = stateOf(services_.fileManager, journal);
+    if (!state)
+        return failed(nullptr);
+    log.write(logLevelNotice, recoverFunction, "A replace of %s had stopped: %s", journal.oldUrl.c_str(),
+              state->label);
+    if (state->recovery == Recovery::nothing)
+        return {};
+    if (log.writes(logLevelDebug))
+        log.write(logLevelDebug, recoverFunction, "Recovering from failed replace by moving: %s to %s",
+                  journal.stagingUrl.c_str(), journal.oldUrl.c_str());
+    if (const auto moved = services_.fileManager.moveItemAtURL(journal.stagingUrl, journal.oldUrl); !moved)
+        return failed(&moved.error());
+    if (orderBetween(journal.oldUrl.deletingLastPathComponent(), services_.configuration.replaceDirectory()) < 0)
+        return failed(nullptr);
+    return {};
+}
+
+} // namespace zor
