@@ -30,6 +30,7 @@
 
 namespace zor {
 
+struct ContainerLayout;
 struct ReplaceJournal;
 struct StoreServices;
 
@@ -208,6 +209,8 @@ private:
     Result<void> stageForDelete(const DeletionBatch& batch, std::size_t index, std::vector<FileURL>& changed);
     /// False, logged, when the container stays where it is.
     bool takeAwayForDelete(const FileURL& container, std::vector<FileURL>& changed);
+    /// The standard subdirectories of the container that `changed` begins with; each is added to it.
+    Result<void> makeSubdirectories(const ContainerLayout& layout, std::vector<FileURL>& changed);
     /// Makes what was moved into or out of these directories durable; the error is not logged.
     std::optional<ZORError> syncDirectories(std::vector<FileURL> changed);
 

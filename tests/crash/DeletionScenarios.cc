@@ -84,6 +84,20 @@ Scenario going(const std::string& name, const std::vector<Request>& victims, std
             .also = [victims](const std::string& root, bool acted) { return judgeGone(root, acted, victims); }};
 }
 
+/// The first of them, in one batch.
+bool stage(Device& device, const Victims& victims, std::size_t count) {
+    ZORClientConnection::DeletionBatch batch;
+    for (std::size_t i = 0; i < count; ++i) {
+        const Acknowledged& victim = victims.at(i);
+        batch.users.push_back(victim.request.userId);
+        batch.uuids.push_back(UUID::parse(victim.uuid));
+        batch.identifiers.emplace_back(victim.request.identifier);
+        batch.classes.emplace_back(static_cast<std::uint64_t>(victim.request.containerClass));
+    }
+    return static_cast<bool>(device.daemon->composition().sharedClientConnection()->stageForDeleteContainersWithUsers(
+        batch, UseLocking::yes));
+}
+
 Scenario deletion() {
     const Request victim{"victim", ContainerClass::dataApplication, mobileUser};
     return going(
@@ -93,6 +107,16 @@ Scenario deletion() {
                 victim.userId, &victim.identifier, victim.containerClass, false);
             return deleted || deleted.error().is(ErrorCode::notFound);
         });
+}
+
+Scenario deletionOfMany() {
+    std::vector<Request> all;
+    for (const char* identifier : {"victim.a", "victim.b", "victim.c"})
+        all.push_back({identifier, ContainerClass::dataApplication, mobileUser});
+    const auto victims = std::make_shared<Victims>();
+    return going(
+        "deletion of many", all, [victims, all](Device& device) { *victims = makeVictims(device, all); },
+        [victims](Device& device) { return stage(device, *victims, victims->size()); });
 }
 
 /// The bundle is the last that refers to one group, its child to another.
@@ -112,19 +136,7 @@ Scenario deletionOfABundle() {
                                     {{std::string(ipc::keys::parentBundleIdOption), app}}));
             *victims = makeVictims(device, all);
         },
-        [victims, count = named.size()](Device& device) {
-            ZORClientConnection::DeletionBatch batch;
-            for (std::size_t i = 0; i < count; ++i) {
-                const Acknowledged& victim = victims->at(i);
-                batch.users.push_back(victim.request.userId);
-                batch.uuids.push_back(UUID::parse(victim.uuid));
-                batch.identifiers.emplace_back(victim.request.identifier);
-                batch.classes.emplace_back(static_cast<std::uint64_t>(victim.request.containerClass));
-            }
-            return static_cast<bool>(
-                device.daemon->composition().sharedClientConnection()->stageForDeleteContainersWithUsers(
-                    batch, UseLocking::yes));
-        });
+        [victims, count = named.size()](Device& device) { return stage(device, *victims, count); });
 }
 
 /// A registration that drops the last references and the system container.
@@ -188,7 +200,7 @@ Scenario firstUseOfGroups() {
 } // namespace
 
 std::vector<Scenario> deletionScenarios() {
-    return {deletion(), deletionOfABundle(), release(), firstUseOfGroups()};
+    return {deletion(), deletionOfMany(), deletionOfABundle(), release(), firstUseOfGroups()};
 }
 
 } // namespace zor::support

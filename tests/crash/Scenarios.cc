@@ -5,7 +5,6 @@
 #include "upcall/packbuff/Packbuff.h"
 #include "upcall/packbuff/UpcallMessage.h"
 
-#include <fstream>
 #include <functional>
 #include <memory>
 #include <stdexcept>
@@ -246,179 +245,6 @@ Scenario launch() {
     return scenario;
 }
 
-// What changes a container that is there. Its identifier, and the file that tells its content from another's.
-const Request changed{"com.example.changed", ContainerClass::dataApplication, mobileUser};
-constexpr const char* contentName = "content";
-
-void writeContent(Device& device, const std::string& container, const std::string& text) {
-    const platform::FileDescriptor directory = openBelow(container);
-    const platform::FileDescriptor file(device.disk->createFile(directory.get(), contentName, 0600));
-    const std::vector<std::uint8_t> bytes(text.begin(), text.end());
-    if (device.disk->write(file.get(), bytes) != 0 || device.disk->sync(file.get()) != 0 ||
-        device.disk->sync(directory.get()) != 0)
-        throw std::runtime_error("no content");
-}
-
-/// Made with a content, and not promised: what is done to it takes it away or changes its place.
-Acknowledged makeWithContent(Device& device, bool transient, const std::string& content) {
-    Request request = changed;
-    request.transient = transient;
-    const auto made = device.daemon->create(request);
-    if (!made.acknowledged)
-        throw std::runtime_error("no container to be changed");
-    writeContent(device, made.acknowledged->path, content);
-    return *made.acknowledged;
-}
-
-UUID uuidOf(const Acknowledged& container) {
-    return UUID::parse(container.uuid).value();
-}
-
-/// The content of the live container; "none" without that file, "missing" without the container.
-std::string contentOfChanged(const std::string& root, std::string* uuid = nullptr) {
-    const StoreFindings findings = judgeStore(readTree(root, {"run"}), Transients::ignored);
-    const auto* found = findings.find(static_cast<std::uint64_t>(changed.containerClass), false, changed.identifier);
-    if (!found)
-        return "missing";
-    if (uuid)
-        *uuid = found->uuid;
-    std::ifstream file(root + "/" + found->path + "/" + contentName);
-    std::string content;
-    return std::getline(file, content) ? content : "none";
-}
-
-Scenario changing(const std::string& name, std::function<void(Device&)> prepare, std::function<void(Device&)> act,
-                  std::function<std::string(const std::string&, bool)> also) {
-    return {.name = name,
-            .prepare = std::move(prepare),
-            .act = std::move(act),
-            .requests = {},
-            .goesOnAfterErrors = false,
-            .also = std::move(also)};
-}
-
-/// The new one in the old one's place. An error of the second move loses the old one; then the new one is where it was.
-Scenario replacement() {
-    struct Both {
-        Acknowledged old;
-        Acknowledged fresh;
-    };
-    const auto both = std::make_shared<Both>();
-    return changing(
-        "replace",
-        [both](Device& device) {
-            both->old = makeWithContent(device, false, "old");
-            both->fresh = makeWithContent(device, true, "new");
-        },
-        [both](Device& device) {
-            device.acted = static_cast<bool>(device.daemon->composition().sharedClientConnection()->replaceContainer(
-                {.oldUuid = uuidOf(both->old),
-                 .newUuid = uuidOf(both->fresh),
-                 .userIdOld = mobileUser,
-                 .userIdNew = mobileUser,
-                 .identifierOld = changed.identifier,
-                 .identifierNew = changed.identifier,
-                 .classOld = changed.containerClass,
-                 .classNew = changed.containerClass},
-                StartDeletionThread::no));
-        },
-        [](const std::string& root, bool acted) -> std::string {
-            const std::string content = contentOfChanged(root);
-            if (content == "new" || (content == "old" && !acted))
-                return "";
-            const StoreFindings findings = judgeStore(readTree(root, {"run"}), Transients::judged);
-            const bool freshIsThere =
-                findings.find(static_cast<std::uint64_t>(changed.containerClass), true, changed.identifier) != nullptr;
-            return content == "missing" && !acted && freshIsThere ? "" : "the content is " + content;
-        });
-}
-
-Scenario wiping() {
-    const auto wiped = std::make_shared<Acknowledged>();
-    return changing(
-        "wipe", [wiped](Device& device) { *wiped = makeWithContent(device, false, "old"); },
-        [](Device& device) {
-            device.acted = static_cast<bool>(
-                device.daemon->composition().sharedClientConnection()->deleteDataContainerContentForUser(
-                    mobileUser, &changed.identifier, changed.containerClass));
-        },
-        [wiped](const std::string& root, bool acted) -> std::string {
-            std::string uuid;
-            const std::string content = contentOfChanged(root, &uuid);
-            if (content == "missing" && !acted)
-                return ""; // an error of the second move: the old content has gone, as it was to
-            if (uuid != wiped->uuid)
-                return "the UUID changed with the content " + content;
-            return content == "none" || (content == "old" && !acted) ? "" : "the content is " + content;
-        });
-}
-
-Scenario infoValue() {
-    const auto container = std::make_shared<Acknowledged>();
-    const auto set = [container](Device& device, const char* text) {
-        const std::string key = "key";
-        const plist::Value value(text);
-        return static_cast<bool>(device.daemon->composition().sharedClientConnection()->setInfoValue(
-            &value, &key,
-            {.userId = mobileUser,
-             .uuid = uuidOf(*container),
-             .identifier = changed.identifier,
-             .containerClass = changed.containerClass},
-            UseLocking::yes));
-    };
-    return changing(
-        "info value",
-        [container, set](Device& device) {
-            *container = makeWithContent(device, false, "old");
-            add(device.promised, *container);
-            if (!set(device, "old"))
-                throw std::runtime_error("the first value was not set");
-        },
-        [set](Device& device) { device.acted = set(device, "new"); },
-        [container](const std::string& root, bool acted) -> std::string {
-            MemoryBootMarker marker;
-            marker.make();
-            platform::LinuxDisk disk;
-            StoreDaemon daemon(root, marker, disk, journalEverywhere);
-            const std::string key = "key";
-            const auto value = daemon.composition().sharedClientConnection()->infoValueForKey(
-                &key,
-                {.userId = mobileUser,
-                 .uuid = uuidOf(*container),
-                 .identifier = changed.identifier,
-                 .containerClass = changed.containerClass},
-                UseLocking::yes);
-            if (value && (*value == plist::Value("new") || (!acted && *value == plist::Value("old"))))
-                return "";
-            return value ? "the value is " + plist::describe(&*value) : "the value is lost";
-        });
-}
-
-Scenario newDirectoryName() {
-    const auto renamed = std::make_shared<Acknowledged>();
-    return changing(
-        "new directory name", [renamed](Device& device) { *renamed = makeWithContent(device, false, "old"); },
-        [renamed](Device& device) {
-            device.acted =
-                static_cast<bool>(device.daemon->composition().sharedClientConnection()->regenerateDirectoryUUIDForUser(
-                    {.userId = mobileUser,
-                     .uuid = uuidOf(*renamed),
-                     .identifier = changed.identifier,
-                     .containerClass = changed.containerClass}));
-        },
-        [renamed](const std::string& root, bool acted) -> std::string {
-            std::string uuid;
-            const std::string content = contentOfChanged(root, &uuid);
-            if (content != "old" || uuid != renamed->uuid)
-                return "the container is " + content;
-            const std::string before = renamed->path.substr(renamed->path.rfind('/') + 1);
-            const StoreFindings findings = judgeStore(readTree(root, {"run"}), Transients::ignored);
-            const auto* found =
-                findings.find(static_cast<std::uint64_t>(changed.containerClass), false, changed.identifier);
-            return acted && found->path.ends_with(before) ? "the acknowledged name is undone" : "";
-        });
-}
-
 } // namespace
 
 std::vector<Scenario> storeScenarios() {
@@ -436,16 +262,12 @@ std::vector<Scenario> storeScenarios() {
         entitlementFile(),
         launch(),
         upcallOfSix(),
-        replacement(),
-        wiping(),
-        infoValue(),
-        newDirectoryName(),
     };
 }
 
 std::vector<Scenario> homeScenarios() {
     return {creation("creation of a data container", ContainerClass::dataApplication, mobileUser), transientAgain(),
-            deathRow(), launch(), replacement()};
+            deathRow(), launch()};
 }
 
 std::string scenarioName(const ::testing::TestParamInfo<Scenario>& parameter) {

@@ -24,6 +24,12 @@ struct Scenario {
     /// Calls for each state that a power cut may leave, at the most: a call that only syncs leaves what the one before
     /// it left, and where few others are made that counts.
     std::size_t callsPerStateMax = 1;
+    /// The damage that the scenario starts from and is there to mend: what a complaint about it names.
+    std::string damage;
+    /// `complaint` unless it is about that.
+    [[nodiscard]] std::string withoutDamage(const std::string& complaint) const {
+        return !damage.empty() && complaint.find(damage) != std::string::npos ? "" : complaint;
+    }
     /// Judges what only this scenario knows of; after a restart. `acted` when act came to its end without an error.
     std::function<std::string(const std::string& root, bool acted)> also;
 };
@@ -32,6 +38,9 @@ struct Scenario {
 std::vector<Scenario> storeScenarios();
 /// Those that work in the user's home.
 std::vector<Scenario> homeScenarios();
+/// What changes a container that is there.
+std::vector<Scenario> changeScenarios();
+std::vector<Scenario> changeScenariosAtHome();
 /// Deletion, the loss of last references, and the first use of groups. They work in the user's home too.
 std::vector<Scenario> deletionScenarios();
 /// As test names are spelled.

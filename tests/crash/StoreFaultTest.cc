@@ -42,8 +42,8 @@ void act(FaultWorld& world, const Scenario& scenario) {
 
 std::string judgeRunningDaemon(Device& device, const Scenario& scenario) {
     const StoreFindings findings = judgeStore(readTree(device.root.path(), {"run"}), Transients::judged);
-    if (!findings.complaint.empty())
-        return "as the error left it: " + findings.complaint;
+    if (const std::string complaint = scenario.withoutDamage(findings.complaint); !complaint.empty())
+        return "as the error left it: " + complaint;
     if (device.daemon->composition().locks().identifiersInUse() != 0)
         return "an identifier is still locked";
     if (!scenario.goesOnAfterErrors)
@@ -67,8 +67,8 @@ std::string judge(FaultWorld& world, const Scenario& scenario, const FaultOutcom
     if (std::string leaked = world.before.leakedSince(); !leaked.empty())
         return "leaked: " + leaked;
     const Leftovers leftovers = outcome.stopped ? Leftovers::none : Leftovers::ofErrors;
-    std::string complaint = judgeAfterRestart(device.root.path(), device.marker, world.probe(), device.promised,
-                                              scenario.requests, leftovers);
+    std::string complaint = scenario.withoutDamage(judgeAfterRestart(device.root.path(), device.marker, world.probe(),
+                                                                     device.promised, scenario.requests, leftovers));
     if (complaint.empty() && scenario.also)
         complaint = scenario.also(device.root.path(), device.acted);
     return complaint;
@@ -125,6 +125,8 @@ TEST_P(StoreFaultTest, StandsEveryStopOnDisk) {
     loopOverFaults("/var/tmp", Home::onRoot, GetParam(), {.kind = FaultKind::stop});
 }
 
+INSTANTIATE_TEST_SUITE_P(ChangeAtHome, HomeFaultTest, ::testing::ValuesIn(changeScenariosAtHome()), scenarioName);
+INSTANTIATE_TEST_SUITE_P(Change, StoreFaultTest, ::testing::ValuesIn(changeScenarios()), scenarioName);
 INSTANTIATE_TEST_SUITE_P(DeletionAtHome, HomeFaultTest, ::testing::ValuesIn(deletionScenarios()), scenarioName);
 INSTANTIATE_TEST_SUITE_P(Deletion, StoreFaultTest, ::testing::ValuesIn(deletionScenarios()), scenarioName);
 INSTANTIATE_TEST_SUITE_P(Home, HomeFaultTest, ::testing::ValuesIn(homeScenarios()), scenarioName);

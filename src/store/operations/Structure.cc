@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // Two repairs of a container: its standard subdirectories made again, and a new name for its directory.
 //
-// A stop leaves some subdirectories made, or the container under its old or its new name; a mapping that then points to
-// nothing is removed at the next launch.
+// A stop leaves some subdirectories made, one perhaps not yet its owner's, until the repair is repeated; or the
+// container under its old or its new name; a mapping that then points to nothing is removed at the next launch.
 #include "daemon/ZORClientConnection.h"
 #include "store/StoreServices.h"
 #include "store/operations/ContainerLayout.h"
@@ -15,21 +15,32 @@ Result<void> ZORClientConnection::recreateDefaultStructureForUser(const Containe
     return services_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
         constexpr const char* function = "recreateDefaultStructureForUser";
         TRY(checkAddress(function, address));
-        const IdentifierLock lock(services_.locks, address.uuid->string(), LockMode::writing);
-        const auto record = TRY(knownContainer(function, address));
-        const FileURL container = record->url();
-        const ContainerLayout layout = layoutOf(address.containerClass, address.userId);
-        for (const char* subdirectory : layout.subdirectories) {
-            const auto made = services_.fileManager.createDirectoryAtURL(
-                container.appendingDirectory(subdirectory), Intermediates::yes,
-                {.mode = layout.subdirectoryMode, .owner = layout.subdirectoryOwner});
-            if (!made)
-                return makeError(services_.log, {"_createSubDirectories", __LINE__}, ErrorCode::subdirectoryFailed,
-                                 &made.error(), LogFlag::yes, "Failed to create sub-dir at %s%s", container.c_str(),
-                                 subdirectory);
+        std::vector<FileURL> changed;
+        {
+            const IdentifierLock lock(services_.locks, address.uuid->string(), LockMode::writing);
+            const auto record = TRY(knownContainer(function, address));
+            changed.push_back(record->url());
+            TRY(makeSubdirectories(layoutOf(address.containerClass, address.userId), changed));
         }
+        if (const auto failed = syncDirectories(changed))
+            return makeError(services_.log, {function, __LINE__}, ErrorCode::subdirectoryFailed, &*failed, LogFlag::yes,
+                             "Failed to create sub-dir at %s%s", changed.front().c_str(), "");
         return {};
     });
+}
+
+Result<void> ZORClientConnection::makeSubdirectories(const ContainerLayout& layout, std::vector<FileURL>& changed) {
+    const FileURL container = changed.front();
+    for (const char* subdirectory : layout.subdirectories) {
+        changed.push_back(container.appendingDirectory(subdirectory));
+        const auto made = services_.fileManager.createDirectoryAtURL(
+            changed.back(), Intermediates::yes, {.mode = layout.subdirectoryMode, .owner = layout.subdirectoryOwner});
+        if (!made)
+            return makeError(services_.log, {"_createSubDirectories", __LINE__}, ErrorCode::subdirectoryFailed,
+                             &made.error(), LogFlag::yes, "Failed to create sub-dir at %s%s", container.c_str(),
+                             subdirectory);
+    }
+    return {};
 }
 
 Result<void> ZORClientConnection::regenerateDirectoryUUIDForUser(const ContainerAddress& address) {
