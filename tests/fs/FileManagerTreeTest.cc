@@ -207,6 +207,20 @@ TEST_F(FileManager, RemovesImmutableFiles) {
     makeFile("tree/other");
     if (!setImmutable(path("tree/file"), true))
         GTEST_SKIP() << "skipped: no immutable files here";
+    for (const auto& [call, line] :
+         {std::pair(DiskCall::setInodeFlags, "Failed to lchflags "), std::pair(DiskCall::unlinkFile, "unlink of ")}) {
+        int calls = call == DiskCall::setInodeFlags ? 1 : 0; // the second unlink: of what is mutable now
+        disk.arm({.error = EIO, .filter = [&](const auto& info) {
+                      return info.call == call && (call != DiskCall::unlinkFile || info.subject == "file") &&
+                             ++calls == 2;
+                  }});
+        EXPECT_FALSE(manager().removeItemAtURL(url("tree")));
+        disk.disarm();
+        EXPECT_EQ(names("tree"), (std::vector<std::string>{"file"})) << line;
+        const auto said = lines.take(3, "removeItemAtURL");
+        EXPECT_TRUE(std::ranges::any_of(said, [&](const std::string& one) { return one.starts_with(line); })) << line;
+    }
+    setImmutable(path("tree/file"), true);
     const auto removed = manager().removeItemAtURL(url("tree"));
     setImmutable(path("tree/file"), false);
     EXPECT_TRUE(removed) << removed.error().text();
@@ -268,6 +282,14 @@ TEST_F(FileManager, PrintsOrphansAndMeasures) {
     EXPECT_EQ(manager().diskUsageForURL(url("junk/f")), 0U);
     EXPECT_EQ(lines.take(3, "diskUsageForURL"),
               (std::vector<std::string>{"Failed to open directory " + path("junk/f") + " : Not a directory"}));
+    // What is not there, or is no place at all.
+    manager().printDirectoryStructureAtURL(url("no"));
+    manager().printDirectoryStructureAtURL(url("no/such"));
+    EXPECT_EQ(lines.take(3, "printDirectoryStructureAtURL"),
+              (std::vector<std::string>{"FTS returned error for " + path("no") + " : No such file or directory",
+                                        "fts_open failed for " + path("no/such") + " : No such file or directory"}));
+    EXPECT_EQ(manager().diskUsageForURL(FileURL()), 0U);
+    EXPECT_EQ(lines.take(3, "diskUsageForURL"), (std::vector<std::string>{"Failed to get path to url "}));
 }
 
 } // namespace

@@ -11,15 +11,6 @@
 namespace zor::house {
 namespace {
 
-std::set<std::string> testNames() {
-    static const std::regex macro(R"(TEST(?:_F|_P)?\((\w+), (\w+)\))");
-    std::set<std::string> names;
-    for (const SourceFile& file : filesBelow({"tests"}, {"Test.cc"}))
-        for (std::sregex_iterator at(file.text.begin(), file.text.end(), macro); at != std::sregex_iterator(); ++at)
-            names.insert((*at)[1].str() + "." + (*at)[2].str());
-    return names;
-}
-
 TEST(SecurityPage, NamesTestsThatExist) {
     static const std::regex named(R"(`(\w+\.\w+)`)");
     const std::set<std::string> tests = testNames();

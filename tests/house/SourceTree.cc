@@ -8,6 +8,7 @@
 #include <filesystem>
 #include <fstream>
 #include <iterator>
+#include <regex>
 #include <stdexcept>
 
 namespace zor::house {
@@ -121,6 +122,15 @@ std::string withoutComments(std::string_view text, Literals literals) {
         }
     }
     return out;
+}
+
+std::set<std::string> testNames() {
+    static const std::regex macro(R"(TEST(?:_F|_P)?\((\w+), (\w+)\))");
+    std::set<std::string> names;
+    for (const SourceFile& file : filesBelow({"tests"}, {"Test.cc"}))
+        for (std::sregex_iterator at(file.text.begin(), file.text.end(), macro); at != std::sregex_iterator(); ++at)
+            names.insert((*at)[1].str() + "." + (*at)[2].str());
+    return names;
 }
 
 std::vector<std::string_view> splitLines(std::string_view text) {

@@ -2,6 +2,7 @@
 // The checkout as the house tests read it: files below it, their text with and without comments, and what they include.
 #pragma once
 
+#include <set>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -34,6 +35,9 @@ std::string withoutComments(std::string_view text, Literals literals);
 
 /// The `#include "..."` directives outside comments.
 std::vector<Include> quotedIncludes(std::string_view text);
+
+/// `Suite.Name` of every test.
+std::set<std::string> testNames();
 
 std::vector<std::string_view> splitLines(std::string_view text);
 

@@ -33,7 +33,10 @@ const std::string noCount = "Failed to get reference count information for group
 
 class Processing : public testing::Test {
 protected:
-    Processing() { world.load(); }
+    Processing() {
+        world.log.setLevel(logLevelDebug);
+        world.load();
+    }
     ZOREntitlementMapping& mapping() { return world.services().entitlements(); }
     ErrorCode process(const std::optional<Dictionary>& entitlements, const std::optional<std::string>& identifier,
                       const Dictionary& options = {}) {

@@ -5,6 +5,7 @@
 #include <fcntl.h>
 #include <filesystem>
 #include <gtest/gtest.h>
+#include <sys/wait.h>
 #include <thread>
 #include <unistd.h>
 
@@ -178,6 +179,50 @@ TEST_F(Known, DiskUsageIsKeptForBundlesAlone) {
     EXPECT_GE(usage(data), dataBytes + 100'000);
     ASSERT_TRUE(set(addressOf(bundle), "com.veltra.Brevance.StaticDiskUsage", "rubbish"));
     EXPECT_GE(usage(bundle), bundleBytes + 100'000);
+    // A disk on which it cannot be kept: it is said, and measured again the next time.
+    ASSERT_TRUE(set(addressOf(bundle), "com.veltra.Brevance.StaticDiskUsage", "rubbish"));
+    world.disk().arm({.error = ENOSPC, .span = support::FaultSpan::fromThenOn});
+    EXPECT_GE(usage(bundle), bundleBytes + 100'000);
+    world.disk().disarm();
+    EXPECT_EQ(
+        world.log.take(3, "diskUsageForUserId"),
+        std::vector<std::string>{"Error setting info value for userId: 33, identifier: com.example, Class: 1: 34"});
+}
+
+// Goal: the retry test ends the daemon as often as it is told, the count outlives each end, and nothing is left when it
+// has succeeded. Method: a child of its own for each call, on disks that fail at first.
+TEST_F(Known, RetryTestCountsDown) {
+    enum class End { crashed, succeeded, failed };
+    const auto call = [&](std::uint64_t crashes) {
+        const pid_t child = ::fork();
+        if (child == 0)
+            ::_exit(static_cast<int>(world.daemonsClient().retryTestForUser(mobile, crashes) ? End::succeeded
+                                                                                             : End::failed));
+        int status = -1;
+        ::waitpid(child, &status, 0);
+        return WIFEXITED(status) ? static_cast<End>(WEXITSTATUS(status)) : End::failed;
+    };
+    const std::string applications = std::string(mobileContainers) + "/Data/Application";
+    world.disk().arm({.error = EIO, .span = support::FaultSpan::fromThenOn});
+    EXPECT_EQ(call(2), End::failed);
+    world.disk().disarm();
+    for (const End end : {End::crashed, End::crashed, End::succeeded}) {
+        EXPECT_EQ(call(2), end);
+        EXPECT_EQ(world.names(applications).size(), end == End::crashed ? 1U : 0U);
+    }
+    // A deletion that may not last is no success; the next call begins anew.
+    for (const End end : {End::crashed, End::failed, End::crashed, End::succeeded}) {
+        bool staged = false;
+        if (end == End::failed)
+            world.disk().arm({.error = EIO, .span = support::FaultSpan::fromThenOn, .filter = [&](const auto& info) {
+                                  staged = staged || (info.call == DiskCall::rename &&
+                                                      info.subject.find("metadata") == std::string::npos);
+                                  return staged && info.call != DiskCall::rename;
+                              }});
+        EXPECT_EQ(call(1), end);
+        world.disk().disarm();
+    }
+    EXPECT_TRUE(world.names(applications).empty());
 }
 
 // Goal: the operations on one container may run beside lookups, listings and each other. Method: threads, for a short

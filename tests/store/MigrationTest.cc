@@ -228,7 +228,7 @@ plist::Dictionary metadataWithGroups(std::uint64_t containerClass, const std::st
 // Goal: groups kept in data containers come into the map and leave the metadata, once; an error keeps the marker away
 // and the next boot does the rest. Method: two containers, of which the second cannot be written the first time.
 TEST(Migration, GroupIdentifiers) {
-    World world;
+    World world({.logLevel = logLevelDebug});
     const std::string data = std::string(mobileContainers) + "/Data/";
     world.putContainer(data + "Application/" + firstUuid, metadataWithGroups(2, "com.example.a", firstUuid));
     world.putContainer(data + "KolvexPlugin/" + secondUuid, metadataWithGroups(4, "com.example.b", secondUuid));
@@ -265,7 +265,7 @@ TEST(Migration, GroupIdentifiers) {
 // Goal: exactly the system containers that nobody is entitled to go, and none when the entitlements are not known.
 // Method: three identifiers; then the same with an entitlement file that cannot be read.
 TEST(Migration, UnentitledSystemContainers) {
-    World world;
+    World world({.logLevel = logLevelDebug});
     const std::string system = std::string(sharedPath) + "/Data/System/";
     constexpr const char* thirdUuid = "33333333-0000-4000-8000-000000000000";
     world.putContainer(system + firstUuid, metadataOf(12, 499, "entitled", firstUuid));

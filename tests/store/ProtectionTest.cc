@@ -353,6 +353,15 @@ TEST_F(Protection, FailuresOfTheSystem) {
             said = said || one.message.find(line) != std::string::npos;
         EXPECT_TRUE(said) << line;
     }
+    // What is set and cannot be recorded is set.
+    world.disk().arm({.error = ENOSPC, .span = support::FaultSpan::fromThenOn, .filter = [](const auto& call) {
+                          return call.call == support::DiskCall::createFile;
+                      }});
+    EXPECT_EQ(change(to(3)), 1U);
+    world.disk().disarm();
+    const auto said = world.log.take();
+    EXPECT_TRUE(std::ranges::any_of(
+        said, [](const auto& one) { return one.message.starts_with("Failed to set protection class info for "); }));
 }
 
 // Goal: the reply of command 19 comes exactly once, at once for what is judged at once, and with the code of the

@@ -28,7 +28,10 @@ std::uint32_t ownerOf(ContainerClass containerClass) {
 
 class Replace : public testing::Test {
 protected:
-    Replace() { world.load(); }
+    Replace() {
+        world.log.setLevel(logLevelDebug);
+        world.load();
+    }
     World world;
 
     FoundContainer make(const std::string& identifier, bool transient, const std::string& content,
@@ -361,6 +364,19 @@ TEST_F(Replace, ARecoveryThatStopsKeepsWhatItStillNeeds) {
     world.restart();
     world.daemonsClient().containerManagerSetup();
     EXPECT_EQ(world.read(old + "/content"), "old");
+    EXPECT_TRUE(nothingIsUnderWay());
+    // A journal that cannot be read names nothing; while it cannot go either, it stays.
+    world.write(journals + "/" + journal + ".plist", "rubbish");
+    world.disk().arm({.error = EIO, .span = support::FaultSpan::fromThenOn});
+    world.log.take();
+    world.daemonsClient().containerManagerSetup();
+    world.disk().disarm();
+    const auto said = world.log.take(3, "_recoverFromReplaceOperationsWithError");
+    EXPECT_TRUE(std::ranges::any_of(said, [](const std::string& line) {
+        return line.find("Failed to remove replace file at ") != std::string::npos;
+    }));
+    EXPECT_EQ(world.names(journals), (std::vector<std::string>{journal + ".plist"}));
+    world.daemonsClient().containerManagerSetup();
     EXPECT_TRUE(nothingIsUnderWay());
 }
 

@@ -3,6 +3,7 @@
 // mappings.
 #include "world/World.h"
 
+#include <filesystem>
 #include <gtest/gtest.h>
 #include <set>
 #include <unistd.h>
@@ -193,6 +194,21 @@ TEST(Setup, GoesOnAfterFailures) {
                               world.path("private/var/second/Containers/Library/Caches/com.veltra.zorvaned/Temp"),
                       }));
     EXPECT_TRUE(world.exists(std::string(cachesPath) + "/Staging/half-made"));
+    // Somebody's link in the place of a directory is neither followed nor emptied.
+    world.makeDirectories("elsewhere/kept");
+    for (const std::string& place : {std::string(libraryPath) + "/Replace", applications}) {
+        std::filesystem::remove_all(world.path(place));
+        ASSERT_EQ(::symlink(world.path("elsewhere").c_str(), world.path(place).c_str()), 0);
+    }
+    world.daemonsClient().rebootContainerManagerSetup();
+    world.daemonsClient().containerManagerSetup();
+    world.drainDeathRow();
+    EXPECT_TRUE(world.exists("elsewhere/kept"));
+    std::set<std::string> unread;
+    for (const LogLine& line : world.log.take())
+        if (line.message.starts_with("Failed to get items at "))
+            unread.insert(line.function);
+    EXPECT_EQ(unread, (std::set<std::string>{cleanup, "_recoverFromReplaceOperationsWithError"}));
 }
 
 // Goal: a mapping is removed, then set; either failure is said and is the answer. Method: a table over class and

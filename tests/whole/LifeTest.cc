@@ -84,7 +84,9 @@ TEST(Life, KilledAtAnyMomentFindsEveryAcknowledgedContainerWhole) {
 // Goal: one daemon a root, an end on request, and start-up errors that say what to do.
 TEST(Life, SecondDaemonAndSigtermAndBrokenCommandLines) {
     DaemonProcess daemon;
+    std::filesystem::create_directories(daemon.path("run/zorvane/zorvaned.status/occupied"));
     daemon.start();
+    EXPECT_NE(daemon.log().find("No status socket: "), std::string::npos); // a help, not a service
     const auto second = daemon.runAnother();
     EXPECT_EQ(second.exitStatus, 1);
     EXPECT_NE(second.output.find("zorvaned: "), std::string::npos) << second.output;
