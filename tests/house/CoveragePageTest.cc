@@ -59,11 +59,12 @@ std::map<std::string, std::string> rowsOf(const std::string& page, std::vector<s
     return rows;
 }
 
-/// Formats in their printed form that each test printed.
+/// Formats in their printed form that each test printed. A test that is gone may have left its recording.
 std::map<std::string, std::set<std::string>> recordings() {
     std::map<std::string, std::set<std::string>> all;
+    const std::set<std::string> tests = testNames();
     for (const auto& file : std::filesystem::directory_iterator(std::getenv("ZORVANE_RECORDINGS"))) {
-        const std::string text = readFile(file.path());
+        const std::string text = tests.contains(file.path().filename()) ? readFile(file.path()) : "";
         for (const std::string_view line : splitLines(text))
             all[file.path().filename()].emplace(line);
     }

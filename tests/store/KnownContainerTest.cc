@@ -77,44 +77,6 @@ TEST_F(Known, InfoValuesLastOrAreRefused) {
     EXPECT_FALSE(metadata->transient);
 }
 
-TEST_F(Known, BadAddressesAreRefused) {
-    const Address good = addressOf(make("com.example"));
-    const std::string key = "k";
-    const plist::Value value(1);
-    struct Row {
-        Address address;
-        ErrorCode code;
-    };
-    auto noUuid = good;
-    noUuid.uuid.reset();
-    auto otherUuid = good;
-    otherUuid.uuid = UUID::random();
-    auto noIdentifier = good;
-    noIdentifier.identifier.reset();
-    auto otherClass = good;
-    otherClass.containerClass = ContainerClass::dataTempDir;
-    auto noClass = good;
-    noClass.containerClass = ContainerClass::max;
-    const Row rows[] = {{noUuid, ErrorCode::invalidObject},
-                        {noClass, ErrorCode::invalidObject},
-                        {otherUuid, ErrorCode::notFound},
-                        {noIdentifier, ErrorCode::notFound},
-                        {otherClass, ErrorCode::notFound}};
-    ZORClientConnection& client = world.daemonsClient();
-    for (const Row& row : rows) {
-        SCOPED_TRACE(&row - rows);
-        EXPECT_TRUE(client.setInfoValue(&value, &key, row.address, UseLocking::yes).error().is(row.code));
-        EXPECT_TRUE(client.infoValueForKey(&key, row.address, UseLocking::yes).error().is(row.code));
-        EXPECT_TRUE(client.metadataForUser(row.address).error().is(row.code));
-        EXPECT_TRUE(client.recreateDefaultStructureForUser(row.address).error().is(row.code));
-        EXPECT_TRUE(client.regenerateDirectoryUUIDForUser(row.address).error().is(row.code));
-        EXPECT_EQ(client.diskUsageForUserId(row.address).error, row.code);
-        EXPECT_EQ(world.services().locks().identifiersInUse(), 0U);
-    }
-    EXPECT_TRUE(client.setInfoValue(&value, nullptr, good, UseLocking::yes).error().is(ErrorCode::valueNotAllowed));
-    EXPECT_TRUE(client.infoValueForKey(nullptr, good, UseLocking::yes).error().is(ErrorCode::valueNotAllowed));
-}
-
 // Goal: what a client broke of its standard structure is whole again; a link that it put there is not followed. Method:
 // subdirectories removed, closed, and swapped for links.
 TEST_F(Known, StructureIsMadeAgain) {
