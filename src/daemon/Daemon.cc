@@ -16,9 +16,6 @@ struct LogSize {
 constexpr LogSize internalLogSize{4, 262'144};
 constexpr LogSize logSize{1, 102'400};
 
-constexpr int lockStateUnlocked = 0;
-constexpr int lockStateLocked = 1;
-
 } // namespace
 
 int Daemon::run() {
@@ -86,14 +83,14 @@ void Daemon::evaluateLockState() {
     const int state = platform.lockState.currentState();
     if (composition_.log().writes(logLevelDebug))
         composition_.log().write(logLevelDebug, "ostrandd_notification_callback", "LockState=%d", state);
-    if (state == lockStateLocked) {
-        if (lastLockState_ != lockStateLocked)
+    if (state == platform::DeviceLockState::locked) {
+        if (lastLockState_ != platform::DeviceLockState::locked)
             platform.lockStateQueue.suspend();
-        lastLockState_ = lockStateLocked;
-    } else if (state == lockStateUnlocked) {
-        if (lastLockState_ == lockStateLocked)
+        lastLockState_ = platform::DeviceLockState::locked;
+    } else if (state == platform::DeviceLockState::unlocked) {
+        if (lastLockState_ == platform::DeviceLockState::locked)
             platform.lockStateQueue.resume();
-        lastLockState_ = lockStateUnlocked;
+        lastLockState_ = platform::DeviceLockState::unlocked;
     }
 }
 

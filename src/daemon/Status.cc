@@ -51,7 +51,7 @@ void Status::addEntitlements(plist::Dictionary& status) {
     plist::Dictionary map = composition_.entitlements().entitlementMappingDict();
     const auto references = [&](GroupType type) {
         std::vector<plist::Dictionary::Entry> groups;
-        for (const auto& [group, holders] : composition_.groups().referencesIn(map, type, LogFlag::no))
+        for (const auto& [group, holders] : groupReferencesIn(map, type, nullptr))
             groups.emplace_back(group, plist::Array(holders.begin(), holders.end()));
         return plist::Dictionary::fromUnsorted(std::move(groups));
     };

@@ -15,9 +15,6 @@ using platform::MutexLock;
 
 namespace {
 
-/// Far above any device's map (a thousand identifiers take about a megabyte), far below what reading could not bear.
-constexpr std::size_t mappingFileBytesMax = std::size_t{64} << 20;
-constexpr std::string_view systemGroupPrefix = "systemgroup.";
 constexpr const char* setFunction = "_setEntitlementDictionaryValues";
 
 } // namespace
@@ -29,7 +26,7 @@ ZOREntitlementMapping::ZOREntitlementMapping(const Log& log, ZORFileManager& fil
       entitlementMappingDict_(_readEntitlementMappingFromDisk()) {}
 
 plist::Dictionary ZOREntitlementMapping::_readEntitlementMappingFromDisk() {
-    auto map = readDictionaryAtURL(entitlementMappingFileUrl_, mappingFileBytesMax, fileManager_);
+    auto map = readEntitlementFile(entitlementMappingFileUrl_, fileManager_);
     if (map)
         return std::move(*map);
     log_.write(logLevelError, __func__, "Failed to read entitlement mapping file at %s.  It may not exist yet",
@@ -70,7 +67,7 @@ std::optional<FileURL> ZOREntitlementMapping::lostFile() {
 Result<void> ZOREntitlementMapping::_writeEntitlementMappingToDisk() {
     configuration_.libraryDirectory(); // makes it again should it have gone
     const auto written = writeToURL(entitlementMappingDict_, entitlementMappingFileUrl_,
-                                    writeAtomically | writeWithoutProtection, mappingFileBytesMax, fileManager_);
+                                    writeAtomically | writeWithoutProtection, entitlementFileBytesMax, fileManager_);
     if (!written)
         return makeError(log_, ZOR_HERE, ErrorCode::entitlementFileNotWritten, &written.error(), LogFlag::yes,
                          "Failed to write entitlement mapping file at %s", entitlementMappingFileUrl_.c_str());
@@ -169,8 +166,7 @@ bool ZOREntitlementMapping::_onQueue_identifierHasCallerRegisteredEntitlements(s
 }
 
 bool ZOREntitlementMapping::_onQueue_identifierHasSystemContainer(std::string_view identifier) const {
-    const plist::Dictionary* entitlements = entitlementsOf(identifier);
-    return entitlements && entitlements->isTrue(entitlementKeys::systemContainer);
+    return ownsSystemContainer(entitlementMappingDict_, identifier);
 }
 
 ZOREntitlementMapping::Identifiers

@@ -13,7 +13,7 @@
 #pragma once
 
 #include "daemon/base/Result.h"
-#include "ipc/Keys.h"
+#include "entitlements/EntitlementFile.h"
 #include "platform/Mutex.h"
 #include "plist/Value.h"
 #include "store/StoreServices.h"
@@ -26,26 +26,6 @@
 #include <vector>
 
 namespace zor {
-
-/// Keys of the map that are no identifiers.
-namespace entitlementMapKeys {
-inline constexpr std::string_view childPluginBundleIds = "com.veltra.Zorvane.ChildPluginBundleIDs";
-// The flags are kept under the names of the options that set them.
-inline constexpr std::string_view registeredByCaller = ipc::keys::registeredByCallerOption;
-inline constexpr std::string_view placeholder = ipc::keys::placeholderOption;
-
-[[nodiscard]] constexpr bool isOne(std::string_view key) {
-    return key == childPluginBundleIds || key == registeredByCaller || key == placeholder;
-}
-} // namespace entitlementMapKeys
-
-/// Keys inside an identifier's entitlements.
-namespace entitlementKeys {
-inline constexpr std::string_view applicationGroups = "com.veltra.security.application-groups";
-inline constexpr std::string_view systemGroups = "com.veltra.security.system-groups";
-inline constexpr std::string_view systemGroupContainers = "com.veltra.security.system-group-containers";
-inline constexpr std::string_view systemContainer = "com.veltra.security.system-container";
-} // namespace entitlementKeys
 
 class ZOREntitlementMapping {
 public:

@@ -12,27 +12,8 @@ namespace zor {
 
 namespace {
 
-struct GroupKind {
-    std::string_view key;
-    std::string_view fallbackKey; // empty: none
-    ContainerClass containerClass;
-};
-
-const GroupKind& kindOf(GroupType type) {
-    static constexpr GroupKind application{entitlementKeys::applicationGroups, {}, ContainerClass::sharedAppGroup};
-    static constexpr GroupKind system{entitlementKeys::systemGroups, entitlementKeys::systemGroupContainers,
-                                      ContainerClass::sharedSystemGroup};
-    return type == GroupType::application ? application : system;
-}
-
-/// The groups that an entry of the map lists for this kind, whatever they are; nullptr for none.
-const plist::Value* groupsIn(const plist::Value* entry, const GroupKind& kind) {
-    const plist::Dictionary* entitlements = entry ? entry->asDictionary() : nullptr;
-    if (!entitlements)
-        return nullptr;
-    const plist::Value* value = entitlements->find(kind.key);
-    const bool nothing = !value || (value->asArray() && value->asArray()->empty());
-    return nothing && !kind.fallbackKey.empty() ? entitlements->find(kind.fallbackKey) : value;
+ContainerClass classOf(GroupType type) {
+    return type == GroupType::application ? ContainerClass::sharedAppGroup : ContainerClass::sharedSystemGroup;
 }
 
 } // namespace
@@ -49,29 +30,6 @@ void ZORGroupManager::forEachUser(GroupType type, const std::function<void(std::
     }
 }
 
-ZORGroupManager::References ZORGroupManager::referencesIn(const plist::Dictionary& map, GroupType type,
-                                                          LogFlag logFlag) const {
-    constexpr const char* function = "_copyReferenceCountSetOfType";
-    const GroupKind& kind = kindOf(type);
-    References references;
-    for (const auto& [identifier, entry] : map) {
-        const plist::Value* groups = groupsIn(&entry, kind);
-        if (!groups)
-            continue;
-        const plist::Array* array = groups->asArray();
-        if (logFlag == LogFlag::yes && !array)
-            log_.write(logLevelError, function, "identifier: %s has non-array type of group container IDs: %s",
-                       ZOR_SHOWN(identifier), plist::describe(groups).c_str());
-        else if (logFlag == LogFlag::yes && log_.writes(logLevelDebug))
-            log_.write(logLevelDebug, function, "Entitlements for identifier %s references container IDs: %s",
-                       ZOR_SHOWN(identifier), plist::describe(groups).c_str());
-        for (const plist::Value& group : array ? *array : plist::Array())
-            if (const std::string* name = group.asString())
-                references[*name].push_back(identifier);
-    }
-    return references;
-}
-
 std::optional<ZORGroupManager::References>
 ZORGroupManager::_copyReferenceCountSetOfType(GroupType type, const plist::Dictionary& map) const {
     if (const auto lost = services_.entitlements.lostFile()) {
@@ -79,7 +37,7 @@ ZORGroupManager::_copyReferenceCountSetOfType(GroupType type, const plist::Dicti
                    "%s holds entitlements that could not be read; references cannot be counted", lost->c_str());
         return std::nullopt;
     }
-    return referencesIn(map, type, LogFlag::yes);
+    return groupReferencesIn(map, type, &log_);
 }
 
 void ZORGroupManager::handleChangeFromOldGroupContainerIds(Identifiers oldGroups, const Identifiers& newGroups,
@@ -106,7 +64,7 @@ void ZORGroupManager::_removeReferenceForGroupIdentifiers(const std::vector<std:
     }
     forEachUser(type, [&](std::uint32_t userId) {
         for (const std::string& group : groups)
-            _removeGroupContainersIfNeededforUser(userId, kindOf(type).containerClass, group, identifier, *references);
+            _removeGroupContainersIfNeededforUser(userId, classOf(type), group, identifier, *references);
     });
 }
 
@@ -153,7 +111,7 @@ std::uint64_t ZORGroupManager::reconcileGroupContainersOfType(GroupType type) {
     }
     std::uint64_t removed = 0;
     forEachUser(type, [&](std::uint32_t userId) {
-        removed += _cleanupUnreferencedGroupContainersForUser(userId, kindOf(type).containerClass, *references);
+        removed += _cleanupUnreferencedGroupContainersForUser(userId, classOf(type), *references);
     });
     return removed;
 }

@@ -8,6 +8,7 @@
 
 #include "daemon/base/ContainerClass.h"
 #include "daemon/base/Result.h"
+#include "entitlements/EntitlementFile.h"
 #include "plist/Value.h"
 
 #include <cstdint>
@@ -25,16 +26,12 @@ class ZORClientConnection;
 class ZORMetadata;
 enum class UseLocking : std::int32_t;
 
-enum class GroupType : std::int32_t { application = 0, system = 1 };
-
 class ZORGroupManager {
 public:
     using Identifiers = std::optional<std::vector<std::string>>;
     /// Group identifier to container path.
     using Paths = std::map<std::string, std::string, std::less<>>;
-    /// Group identifier to the identifiers whose entitlements list it, one for each time that they do: as many as there
-    /// are references.
-    using References = std::map<std::string, std::vector<std::string>, std::less<>>;
+    using References = GroupReferences;
 
     /// `services` may still be in the making.
     ZORGroupManager(const Log& log, StoreServices& services) : log_(log), services_(services) {}
@@ -56,8 +53,6 @@ public:
                                               const std::string& identifier, const plist::Dictionary& map);
     /// Stages every group container that the map does not refer to. At the boot, before clients are served.
     std::uint64_t reconcileGroupContainersOfType(GroupType type);
-    /// Who refers to which group, as the deletions count it. Lists that do not count are said with LogFlag::yes.
-    [[nodiscard]] References referencesIn(const plist::Dictionary& map, GroupType type, LogFlag logFlag) const;
 
 private:
     /// nullopt, logged, when the map is known to be incomplete.

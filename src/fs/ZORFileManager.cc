@@ -65,12 +65,15 @@ Result<void> ZORFileManager::makeNewDirectory(const FileURL& url, Intermediates 
                           errorText(EEXIST));
     if (made < 0)
         return posixError(ZOR_HERE, -made, "%s of %s failed: %s", verb, temporaryPath.c_str(), errorText(-made));
-    TRY(applyAttributes(parent->get(), name, temporaryPath, attributes));
-    const int renamed = disk_.rename(parent->get(), name.c_str(), parent->get(), finalName.c_str(), 0);
-    if (renamed < 0)
-        return posixError(ZOR_HERE, -renamed, "failed to rename from %s to %s : %s", temporaryPath.c_str(), url.c_str(),
-                          errorText(-renamed));
-    return {};
+    Result<void> placed = applyAttributes(parent->get(), name, temporaryPath, attributes);
+    if (placed)
+        if (const int renamed = disk_.rename(parent->get(), name.c_str(), parent->get(), finalName.c_str(), 0);
+            renamed < 0)
+            placed = posixError(ZOR_HERE, -renamed, "failed to rename from %s to %s : %s", temporaryPath.c_str(),
+                                url.c_str(), errorText(-renamed));
+    if (!placed)
+        (void)disk_.removeDirectory(parent->get(), name.c_str());
+    return placed;
 }
 
 Result<void> ZORFileManager::applyAttributes(int parent, const std::string& name, const std::string& path,

@@ -3,6 +3,7 @@
 #include "fs/AtomicFile.h"
 #include "fs/BulkDirectoryRead.h"
 #include "fs/DiskUsage.h"
+#include "fs/LeftoverNames.h"
 #include "fs/MetadataFileName.h"
 #include "fs/RecursiveCopy.h"
 #include "fs/RecursiveRemove.h"
@@ -21,8 +22,6 @@ using fs::WalkEntryKind;
 using fs::WalkStep;
 
 namespace {
-
-constexpr const char* copyPrefix = ".zorvaned-copy-";
 
 std::string below(const FileURL& root, const std::string& relative) {
     return relative.empty() ? root.path() : root.path() + "/" + relative;
@@ -115,7 +114,7 @@ Result<void> ZORFileManager::copyTree(const FileURL& source, const FileURL& dest
     if (!from || !to) {
         status = -(from ? to.error() : from.error());
     } else {
-        const std::string hidden = fs::uniqueName(copyPrefix);
+        const std::string hidden = fs::uniqueName(fs::copyPrefix);
         const int directory = to->directory.get();
         status = fs::copyTree(disk_, from->directory.get(), from->name.c_str(), directory, hidden.c_str());
         // Nothing of a copy may be missing once it has its name, whatever the power does.
@@ -167,7 +166,7 @@ int ZORFileManager::removeMovedSource(const FileURL& source, const FileURL& dest
     if (!from)
         return -from.error();
     const int directory = from->directory.get();
-    const std::string hidden = fs::uniqueName(copyPrefix);
+    const std::string hidden = fs::uniqueName(fs::copyPrefix);
     // The source leaves its name in one step, when the copy cannot lose its own any more; only then it is taken apart.
     int status = syncParent(destination);
     if (status == 0)
@@ -288,7 +287,7 @@ std::vector<FileURL> ZORFileManager::itemsNamed(const FileURL& directory, bool (
 }
 
 std::vector<FileURL> ZORFileManager::copyLeftoversInDirectoryAtURL(const FileURL& directory) {
-    return itemsNamed(directory, [](std::string_view name) { return name.starts_with(copyPrefix); });
+    return itemsNamed(directory, fs::isCopyLeftover);
 }
 
 std::vector<FileURL> ZORFileManager::writeLeftoversInDirectoryAtURL(const FileURL& directory) {

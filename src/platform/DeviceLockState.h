@@ -11,7 +11,9 @@ namespace zor::platform {
 class DeviceLockState {
 public:
     virtual ~DeviceLockState() = default;
-    /// 0 unlocked, 1 locked, other numbers for other conditions. Any thread.
+    static constexpr int unlocked = 0;
+    static constexpr int locked = 1;
+    /// One of these, or another number for another condition. Any thread.
     [[nodiscard]] virtual int currentState() const = 0;
     /// Calls `changed` on the loop whenever the state may have changed. 0, else a status to log.
     virtual int registerForChanges(RunLoop& loop, std::function<void()> changed) = 0;

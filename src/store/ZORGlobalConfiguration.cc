@@ -15,19 +15,11 @@ constexpr DirectoryAttributes ownDirectory{.mode = 0755, .protectionClass = 4};
 constexpr DirectoryAttributes plainDirectory{.mode = 0755};
 constexpr DirectoryAttributes bundleOwnedDirectory{.mode = 0755, .owner = bundleOwnerUserId};
 
-FileURL place(const ZORFileManager& fileManager, std::string_view systemPath) {
-    return FileURL::directory(fileManager.resolver().root().path(systemPath));
-}
-
 } // namespace
 
 ZORGlobalConfiguration::ZORGlobalConfiguration(const Log& log, ZORFileManager& fileManager,
                                                const platform::PasswordDatabase& passwords)
-    : log_(log), fileManager_(fileManager), passwords_(passwords), homeDirectory_(place(fileManager, names::rootHome)),
-      brevadHomeDirectory_(place(fileManager, names::brevadHome)),
-      sharedContainersDirectory_(place(fileManager, names::sharedContainers)),
-      temporaryDirectory_(place(fileManager, names::temporary)),
-      formerContainersDirectory_(place(fileManager, names::formerContainers)) {}
+    : log_(log), fileManager_(fileManager), passwords_(passwords), places_(fileManager.resolver()) {}
 
 void ZORGlobalConfiguration::makeDirectory(const FileURL& url, const DirectoryAttributes& attributes,
                                            const char* function, const char* what, Intermediates intermediates) {
@@ -50,77 +42,74 @@ ZORPerUserConfiguration* ZORGlobalConfiguration::getPerUserConfigurationForUserI
 
 FileURL ZORGlobalConfiguration::sharedContainersDirectory() {
     const RecursiveMutexLock held(lock_);
-    makeDirectory(sharedContainersDirectory_, plainDirectory, __func__, "shared container dir");
-    return sharedContainersDirectory_;
+    makeDirectory(places_.sharedContainersDirectory(), plainDirectory, __func__, "shared container dir");
+    return places_.sharedContainersDirectory();
 }
 
 FileURL ZORGlobalConfiguration::logDirectory() {
-    FileURL url = homeDirectory_.appendingDirectory(names::logs);
+    FileURL url = places_.logDirectory();
     makeDirectory(url, ownDirectory, __func__, "log directory");
     return url;
 }
 
 FileURL ZORGlobalConfiguration::cachesDirectory() {
     const RecursiveMutexLock held(lock_);
-    FileURL url = homeDirectory_.appendingDirectory(names::caches);
+    FileURL url = places_.cachesDirectory();
     makeDirectory(url, ownDirectory, __func__, "cache dir");
     return url;
 }
 
 FileURL ZORGlobalConfiguration::libraryDirectory() {
     const RecursiveMutexLock held(lock_);
-    FileURL url = homeDirectory_.appendingDirectory(names::library);
+    FileURL url = places_.libraryDirectory();
     makeDirectory(url, ownDirectory, __func__, "library dir");
     return url;
 }
 
 FileURL ZORGlobalConfiguration::transientDirectory() {
     const RecursiveMutexLock held(lock_);
-    FileURL url = cachesDirectory().appendingDirectory(names::transient);
+    cachesDirectory();
+    FileURL url = places_.transientDirectory();
     makeDirectory(url, plainDirectory, __func__, "transient dir");
     return url;
 }
 
 FileURL ZORGlobalConfiguration::stagingDirectory() {
     const RecursiveMutexLock held(lock_);
-    FileURL url = cachesDirectory().appendingDirectory(names::staging);
+    cachesDirectory();
+    FileURL url = places_.stagingDirectory();
     makeDirectory(url, plainDirectory, __func__, "staging dir");
     return url;
 }
 
 FileURL ZORGlobalConfiguration::deathrowDirectory() {
     const RecursiveMutexLock held(lock_);
-    FileURL url = cachesDirectory().appendingDirectory(names::deathrow);
+    cachesDirectory();
+    FileURL url = places_.deathrowDirectory();
     makeDirectory(url, plainDirectory, __func__, "deathrow dir");
     return url;
 }
 
 FileURL ZORGlobalConfiguration::replaceDirectory() {
     const RecursiveMutexLock held(lock_);
-    FileURL url = libraryDirectory().appendingDirectory(names::replace);
+    libraryDirectory();
+    FileURL url = places_.replaceDirectory();
     makeDirectory(url, plainDirectory, __func__, "replace dir");
     return url;
 }
 
 FileURL ZORGlobalConfiguration::bundleDirectory() {
     const RecursiveMutexLock held(lock_);
-    FileURL url = sharedContainersDirectory().appendingDirectory(names::bundle);
+    sharedContainersDirectory();
+    FileURL url = places_.bundleDirectory();
     makeDirectory(url, plainDirectory, __func__, "bundle dir");
     return url;
-}
-
-FileURL ZORGlobalConfiguration::formerBundleDirectory() const {
-    return formerContainersDirectory_.appendingDirectory(names::bundle);
-}
-
-FileURL ZORGlobalConfiguration::formerBundleDirectory(ContainerClass containerClass) const {
-    return formerContainersDirectory_.appendingDirectory(className(containerClass));
 }
 
 FileURL ZORGlobalConfiguration::transientBundleDirectory() {
     const RecursiveMutexLock held(lock_);
     // One level at a time, never the home itself: the home of another service is not this daemon's to make.
-    FileURL url = brevadHomeDirectory_;
+    FileURL url = places_.brevadHomeDirectory();
     for (const std::string_view level : names::cachesLevels) {
         url = url.appendingDirectory(level);
         makeDirectory(url, bundleOwnedDirectory, __func__, "transient bundle dir", Intermediates::no);

@@ -12,6 +12,7 @@
 #include "fs/ZORFileManager.h"
 #include "platform/Mutex.h"
 #include "platform/Queries.h"
+#include "store/StorePlaces.h"
 #include "store/ZORPerUserConfiguration.h"
 
 #include <array>
@@ -41,10 +42,12 @@ public:
     FileURL replaceDirectory();
     FileURL bundleDirectory();
     /// Where an older system kept bundle containers, and those of one class; not made here.
-    [[nodiscard]] FileURL formerBundleDirectory() const;
-    [[nodiscard]] FileURL formerBundleDirectory(ContainerClass containerClass) const;
+    [[nodiscard]] FileURL formerBundleDirectory() const { return places_.formerBundleDirectory(); }
+    [[nodiscard]] FileURL formerBundleDirectory(ContainerClass containerClass) const {
+        return places_.formerBundleDirectory(containerClass);
+    }
     /// DIR/tmp; the system's, not made here.
-    [[nodiscard]] FileURL temporaryDirectory() const { return temporaryDirectory_; }
+    [[nodiscard]] FileURL temporaryDirectory() const { return places_.temporaryDirectory(); }
 
     /// The class directory, made if missing; absent only for a class or user that has none.
     std::optional<FileURL> containerDirectoryURLForUser(std::uint32_t userId, ContainerClass containerClass,
@@ -60,11 +63,7 @@ private:
     const Log& log_;
     ZORFileManager& fileManager_;
     const platform::PasswordDatabase& passwords_;
-    const FileURL homeDirectory_;
-    const FileURL brevadHomeDirectory_;
-    const FileURL sharedContainersDirectory_;
-    const FileURL temporaryDirectory_;
-    const FileURL formerContainersDirectory_;
+    const StorePlaces places_;
     platform::RecursiveMutex lock_;
     std::map<std::uint32_t, std::unique_ptr<ZORPerUserConfiguration>> perUserConfigurations_ ZOR_GUARDED_BY(lock_);
 };

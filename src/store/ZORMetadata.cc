@@ -20,9 +20,11 @@ constexpr std::string_view identifierKey = "ZORMetadataIdentifier";     // strin
 constexpr std::string_view uuidKey = "ZORMetadataUUID";                 // string
 constexpr std::string_view infoKey = "ZORMetadataInfo";                 // dictionary; may be missing
 
-ZORError refusal(ErrorCode code, int line, std::string description) {
-    return {Here{"readAndValidateMetadataAtUrl", line}, ErrorDomain::zor, static_cast<int>(code),
-            std::move(description)};
+std::unexpected<MetadataRefusal> refusal(MetadataRule rule, ErrorCode code, int line, std::string description,
+                                         std::shared_ptr<const ZORError> cause = nullptr) {
+    return std::unexpected(MetadataRefusal{rule,
+                                           {Here{"readAndValidateMetadataAtUrl", line}, ErrorDomain::zor,
+                                            static_cast<int>(code), std::move(description), std::move(cause)}});
 }
 
 /// The 64 bits of an integer of either sign, as the file's readers take it.
@@ -40,7 +42,8 @@ std::string_view withoutLastComponent(std::string_view path) {
 
 } // namespace
 
-#define ZOR_REFUSE(...) return refusal(ErrorCode::metadataInvalid, __LINE__, formatted(__VA_ARGS__))
+#define ZOR_REFUSE(rule, ...)                                                                                          \
+    return refusal(MetadataRule::rule, ErrorCode::metadataInvalid, __LINE__, formatted(__VA_ARGS__))
 
 ContainerPlace::ContainerPlace(std::shared_ptr<const std::string> parentPath, std::string_view name)
     : parentPath_(std::move(parentPath)) {
@@ -88,47 +91,51 @@ Result<void> ZORMetadata::writeMetadataToDiskWithError(const Log& log, ZORFileMa
     return {};
 }
 
-Result<std::shared_ptr<ZORMetadata>> parseMetadata(std::span<const std::uint8_t> bytes, const ContainerPlace& place,
-                                                   std::uint32_t userId, CheckClassPath checkClassPath) {
+std::expected<std::shared_ptr<ZORMetadata>, MetadataRefusal> parseMetadata(std::span<const std::uint8_t> bytes,
+                                                                           const ContainerPlace& place,
+                                                                           std::uint32_t userId,
+                                                                           CheckClassPath checkClassPath) {
     const auto value = plist::readPropertyList(bytes);
     const plist::Dictionary* content = value ? value->asDictionary() : nullptr;
     if (!content)
-        return refusal(ErrorCode::metadataUnreadable, __LINE__,
+        return refusal(MetadataRule::readable, ErrorCode::metadataUnreadable, __LINE__,
                        formatted("Failed to read metadata at URL %s", place.url().c_str()));
     const plist::Value* persona = content->find(personaKey);
     if (persona) {
         const auto stored = integerBits(*persona);
         if (!stored || static_cast<std::uint32_t>(*stored) != userId)
-            ZOR_REFUSE("Incorrect UserId: %s, expecting: %u at %s", plist::describe(persona).c_str(), userId,
+            ZOR_REFUSE(user, "Incorrect UserId: %s, expecting: %u at %s", plist::describe(persona).c_str(), userId,
                        place.url().c_str());
     }
     const std::string* identifier = content->string(identifierKey);
     if (!identifier)
-        ZOR_REFUSE("Invalid metadata Identifier: %s at %s", plist::describe(content->find(identifierKey)).c_str(),
-                   place.url().c_str());
+        ZOR_REFUSE(identifier, "Invalid metadata Identifier: %s at %s",
+                   plist::describe(content->find(identifierKey)).c_str(), place.url().c_str());
     const std::string* uuidString = content->string(uuidKey);
     if (!uuidString)
-        ZOR_REFUSE("Invalid metadata UUID String: %s at %s", plist::describe(content->find(uuidKey)).c_str(),
+        ZOR_REFUSE(uuid, "Invalid metadata UUID String: %s at %s", plist::describe(content->find(uuidKey)).c_str(),
                    place.url().c_str());
     const auto uuid = UUID::parse(*uuidString);
     if (!uuid)
-        ZOR_REFUSE("Invalid metadata UUID: %s at %s", ZOR_SHOWN(*uuidString), place.url().c_str());
+        ZOR_REFUSE(uuid, "Invalid metadata UUID: %s at %s", ZOR_SHOWN(*uuidString), place.url().c_str());
     const plist::Value* classValue = content->find(contentClassKey);
     const auto classNumber = classValue ? integerBits(*classValue) : std::nullopt;
     if (!classNumber)
-        ZOR_REFUSE("Invalid metadata Class: %s at %s", plist::describe(classValue).c_str(), place.url().c_str());
+        ZOR_REFUSE(containerClass, "Invalid metadata Class: %s at %s", plist::describe(classValue).c_str(),
+                   place.url().c_str());
     if (!ipc::isContainerClass(*classNumber))
-        ZOR_REFUSE("Invalid metadata Content Class: %ld at %s", static_cast<long>(*classNumber), place.url().c_str());
+        ZOR_REFUSE(containerClass, "Invalid metadata Content Class: %ld at %s", static_cast<long>(*classNumber),
+                   place.url().c_str());
     const auto containerClass = static_cast<ContainerClass>(*classNumber);
     const plist::Value* info = content->find(infoKey);
     if (info && !info->asDictionary())
-        ZOR_REFUSE("Invalid metadata Info: %s at %s", plist::describe(info).c_str(), place.url().c_str());
+        ZOR_REFUSE(info, "Invalid metadata Info: %s at %s", plist::describe(info).c_str(), place.url().c_str());
     if (checkClassPath == CheckClassPath::yes) {
         // The class directory is named by two components; a record proves that it lies in the one of its own class.
         const std::string_view base = withoutLastComponent(withoutLastComponent(place.parentPath()));
         const std::string expected = std::string(base) + "/" + className(containerClass);
         if (expected != place.parentPath())
-            ZOR_REFUSE("Invalid metadata-URLs should match: %s : %s", place.url().c_str(), expected.c_str());
+            ZOR_REFUSE(place, "Invalid metadata-URLs should match: %s : %s", place.url().c_str(), expected.c_str());
     }
     return std::make_shared<ZORMetadata>(
         userId, *uuid, containerClass, *identifier,
@@ -141,15 +148,21 @@ MetadataReader::MetadataReader(int directory, std::shared_ptr<const std::string>
       formerOwner_(formerOwner) {}
 
 Result<std::shared_ptr<ZORMetadata>> MetadataReader::read(const char* name) const {
+    auto judged = judge(name);
+    if (!judged)
+        return std::move(judged).error().error;
+    return std::move(*judged);
+}
+
+std::expected<std::shared_ptr<ZORMetadata>, MetadataRefusal> MetadataReader::judge(const char* name) const {
     const ContainerPlace place(parentPath_, name);
     const std::string relative = std::string(name) + "/" + names::metadataFile;
     const auto bytes = fs::readOwnedFile(directory_, relative.c_str(), fs::metadataFileBytesMax, formerOwner_);
     if (!bytes) {
         const ZORError cause = posixError(ZOR_HERE, bytes.error(), "%s", errorText(bytes.error()));
-        return ZORError(Here{"readAndValidateMetadataAtUrl", __LINE__}, ErrorDomain::zor,
-                        static_cast<int>(ErrorCode::metadataUnreadable),
-                        formatted("Failed to read metadata at URL %s", place.url().c_str()),
-                        std::make_shared<const ZORError>(cause));
+        return refusal(MetadataRule::readable, ErrorCode::metadataUnreadable, __LINE__,
+                       formatted("Failed to read metadata at URL %s", place.url().c_str()),
+                       std::make_shared<const ZORError>(cause));
     }
     return parseMetadata(*bytes, place, userId_, checkClassPath_);
 }

@@ -16,6 +16,7 @@
 #include "plist/Value.h"
 
 #include <atomic>
+#include <expected>
 #include <memory>
 #include <optional>
 #include <span>
@@ -94,6 +95,15 @@ private:
 
 enum class CheckClassPath { no, yes };
 
+/// What a metadata file fails to be, in the order in which it is looked at.
+enum class MetadataRule { readable, user, identifier, uuid, containerClass, info, place };
+
+/// Why a metadata file is not believed.
+struct MetadataRefusal {
+    MetadataRule rule;
+    ZORError error; // not logged
+};
+
 /// Reads and judges the metadata of the container at `url` for a user; errors 12 and 29, logged. Changes nothing. A
 /// file of `formerOwner` is believed as well.
 Result<std::shared_ptr<ZORMetadata>> readAndValidateMetadataAtUrl(const Log& log, ZORFileManager& fileManager,
@@ -110,6 +120,8 @@ public:
                    CheckClassPath checkClassPath, std::optional<uid_t> formerOwner = std::nullopt);
     /// The container `name` in the directory. Any thread.
     [[nodiscard]] Result<std::shared_ptr<ZORMetadata>> read(const char* name) const;
+    /// The same, with the rule that it breaks.
+    [[nodiscard]] std::expected<std::shared_ptr<ZORMetadata>, MetadataRefusal> judge(const char* name) const;
 
 private:
     const int directory_;
@@ -120,8 +132,8 @@ private:
 };
 
 /// The judgement alone, on the bytes of a file: what a fuzzer calls.
-[[nodiscard]] Result<std::shared_ptr<ZORMetadata>> parseMetadata(std::span<const std::uint8_t> bytes,
-                                                                 const ContainerPlace& place, std::uint32_t userId,
-                                                                 CheckClassPath checkClassPath);
+[[nodiscard]] std::expected<std::shared_ptr<ZORMetadata>, MetadataRefusal>
+parseMetadata(std::span<const std::uint8_t> bytes, const ContainerPlace& place, std::uint32_t userId,
+              CheckClassPath checkClassPath);
 
 } // namespace zor

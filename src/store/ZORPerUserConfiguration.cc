@@ -2,7 +2,7 @@
 #include "store/ZORPerUserConfiguration.h"
 
 #include "daemon/base/UserIdentity.h"
-#include "store/Names.h"
+#include "store/StorePlaces.h"
 
 #include <climits>
 #include <cstdlib>
@@ -19,17 +19,23 @@ ZORPerUserConfiguration::initWithUserId(std::uint32_t userId, const Log& log, ZO
         return nullptr;
     }
     std::unique_ptr<ZORPerUserConfiguration> made(new ZORPerUserConfiguration(userId, log, fileManager));
-    if (const auto entry = passwords.entryForUserId(userId)) {
-        // A home may be reached through links that its administrator made; below it, none is followed.
-        char resolved[PATH_MAX];
-        const char* path = ::realpath(entry->homeDirectory.c_str(), resolved);
-        made->userHomeDirectory_ = FileURL::directory(path ? path : entry->homeDirectory);
-    } else {
+    made->userHomeDirectory_ = homeOf(passwords, userId);
+    if (!made->userHomeDirectory_)
         log.write(logLevelError, __func__, "Failed to getpwuid for uid: %u", userId);
-    }
     log.write(logLevelError, __func__, "user home Dir: %s",
               made->userHomeDirectory_ ? made->userHomeDirectory_->c_str() : "(null)");
     return made;
+}
+
+std::optional<FileURL> ZORPerUserConfiguration::homeOf(const platform::PasswordDatabase& passwords,
+                                                       std::uint32_t userId) {
+    const auto entry = passwords.entryForUserId(userId);
+    if (!entry)
+        return std::nullopt;
+    // A home may be reached through links that its administrator made; below it, none is followed.
+    char resolved[PATH_MAX];
+    const char* path = ::realpath(entry->homeDirectory.c_str(), resolved);
+    return FileURL::directory(path ? path : entry->homeDirectory);
 }
 
 bool ZORPerUserConfiguration::existsUserBaseDirectory() {
@@ -47,17 +53,16 @@ std::optional<FileURL> ZORPerUserConfiguration::userBaseDirectory() {
     const RecursiveMutexLock held(lock_);
     if (!userHomeDirectory_)
         return std::nullopt;
-    FileURL url = userHomeDirectory_->appendingDirectory(names::userContainers);
+    FileURL url = StorePlaces::userBaseDirectory(*userHomeDirectory_);
     makeDirectory(url, __func__, "user base");
     return url;
 }
 
 std::optional<FileURL> ZORPerUserConfiguration::transientDirectory() {
     const RecursiveMutexLock held(lock_);
-    const auto base = userBaseDirectory();
-    if (!base)
+    if (!userBaseDirectory())
         return std::nullopt;
-    FileURL url = base->appendingDirectory(names::caches).appendingDirectory(names::transient);
+    FileURL url = StorePlaces::userTransientDirectory(*userHomeDirectory_);
     makeDirectory(url, __func__, "transient");
     return url;
 }

@@ -23,6 +23,10 @@ public:
                                                                    ZORFileManager& fileManager,
                                                                    const platform::PasswordDatabase& passwords);
 
+    /// The home that the password database names, without links; absent when it names none.
+    [[nodiscard]] static std::optional<FileURL> homeOf(const platform::PasswordDatabase& passwords,
+                                                       std::uint32_t userId);
+
     [[nodiscard]] std::uint32_t userId() const { return userId_; }
     [[nodiscard]] const std::optional<FileURL>& userHomeDirectory() const { return userHomeDirectory_; }
     /// Whether the home exists; makes nothing.

@@ -185,7 +185,7 @@ Scenario structure() {
             const bool mended = std::filesystem::is_directory(path + "/Library/Caches");
             return acted && !mended ? "what was acknowledged is missing" : "";
         });
-    scenario.damage = " Library/Caches"; // missing, or made and not yet its owner's
+    scenario.damage = "Library/Caches"; // missing, or made and not yet its owner's
     scenario.pointsMin = 3;
     return scenario;
 }

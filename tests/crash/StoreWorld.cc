@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "crash/StoreWorld.h"
 
+#include "check/StoreCheck.h"
 #include "daemon/Daemon.h"
 #include "support/ProcessResources.h"
 
@@ -138,7 +139,7 @@ fs::Ordering noOrderAnywhere(int) {
 
 StoreDaemon::StoreDaemon(const std::string& root, platform::BootMarker& marker, platform::Disk& disk,
                          fs::Durability::Probe probe)
-    : root_(root), platform_(openPlatform(root)), protection_(platform_->root(), disk, platform_->roles().lockState),
+    : root_(root), platform_(openPlatform(root)), protection_(disk, platform_->roles().lockState),
       sandbox_(platform_->root(), disk),
       composition_(std::make_unique<Composition>(
           withRoles(*platform_, disk, log_, protection_, sandbox_, marker, queue_), probe)) {
@@ -195,6 +196,27 @@ bool Device::create(const Request& request) {
     return answer.acknowledged.has_value();
 }
 
+namespace {
+
+/// What a user would be told of a store that was launched: nothing, but what the next boot or write clears, and empty
+/// directories that never got their names.
+std::string judgeByCheck(const std::string& root, const platform::BootMarker& marker) {
+    const auto system = check::CheckedSystem::open(root);
+    if (!system)
+        return "the store cannot be checked: " + system.error();
+    for (const check::Finding& finding : check::checkStore(
+             **system, {.daemonServes = true, .pause = std::chrono::milliseconds(0), .bootMarker = &marker})) {
+        const bool allowed = finding.mender == check::Mender::boot || finding.mender == check::Mender::nextWrite ||
+                             finding.code == check::FindingCode::directoryLeftover;
+        if (!allowed && !check::pageOf(finding.code).isNote)
+            return "the check finds " + std::string(check::pageOf(finding.code).word) + " at " + finding.path + ": " +
+                   finding.what;
+    }
+    return "";
+}
+
+} // namespace
+
 std::string judgeAfterRestart(const std::string& root, platform::BootMarker& marker, fs::Durability::Probe probe,
                               const std::vector<Acknowledged>& promised, const std::vector<Request>& requests,
                               Leftovers leftovers) {
@@ -215,6 +237,8 @@ std::string judgeAfterRestart(const std::string& root, platform::BootMarker& mar
             return "after the launch: " + complaint + daemon.log();
         if (std::string complaint = judgeRequests(daemon, root, kept, requests, leftovers); !complaint.empty())
             return complaint;
+        if (std::string complaint = judgeByCheck(root, marker); !complaint.empty())
+            return complaint + daemon.log();
     }
     return before.leakedSince();
 }

@@ -130,7 +130,8 @@ struct Device {
 
 /// Judges the tree as it lies, launches a new daemon over it with the real disk, and judges what it makes of it:
 /// nothing half made under a final name, nothing promised lost, staging and death row empty, and each request either
-/// served by what is there or answered as not found, then created. A complaint or nothing.
+/// served by what is there or answered as not found, then created; at the end `zorvanectl check` would find nothing. A
+/// complaint or nothing.
 enum class Leftovers { none, ofErrors };
 std::string judgeAfterRestart(const std::string& root, platform::BootMarker& marker, fs::Durability::Probe probe,
                               const std::vector<Acknowledged>& promised, const std::vector<Request>& requests,

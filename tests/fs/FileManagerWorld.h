@@ -43,7 +43,7 @@ protected:
     void open() {
         root_ = std::make_unique<platform::SystemRoot>(platform::SystemRoot::open(directory_.path()).value());
         EXPECT_EQ(root_->makeRuntimeDirectory(realDisk_), 0);
-        protection_ = std::make_unique<platform::XattrProtectionClass>(*root_, disk, lockState);
+        protection_ = std::make_unique<platform::XattrProtectionClass>(disk, lockState);
         manager_ = std::make_unique<ZORFileManager>(log, *root_, disk, *protection_);
     }
 

@@ -17,7 +17,7 @@ using Messages = std::map<std::string, std::set<std::string>>;
 /// Adds the messages of a source to `messages`.
 void addMessages(Messages& messages, std::string_view text);
 
-/// All below src/.
+/// All below src/ but those of the check, which the tool prints.
 Messages messagesOfTheDaemon();
 
 /// ErrorCode's numbers by their names.

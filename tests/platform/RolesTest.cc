@@ -321,7 +321,7 @@ public:
 TEST(FileProtectionClass, RefusesWhatALockTakesAway) {
     TestRoot test;
     SettableLockState lock;
-    XattrProtectionClass protection(test.root(), test.disk(), lock);
+    XattrProtectionClass protection(test.disk(), lock);
     test.write("file", "x");
     const FileDescriptor file(::open(test.path("file").c_str(), O_RDONLY | O_CLOEXEC));
     EXPECT_EQ(protection.classOf(file.get()), 3);

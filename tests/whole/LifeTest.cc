@@ -137,17 +137,28 @@ TEST(Life, RebootClearsTransientContainersAndOrphans) {
     EXPECT_TRUE(daemon.client().createOrLookup({.containerClass = dataApplication, .user = 501, .identifier = "kept"}));
 }
 
+struct ToolCall {
+    std::vector<std::string> arguments;
+    int exitStatus;
+    const char* inOutput;
+};
+void expectCall(const std::string& root, const ToolCall& row) {
+    std::vector<std::string> all = {programPath("zorvanectl"), "--root", root};
+    if (!row.arguments.empty() && row.arguments[0] == "--root")
+        all.resize(1);
+    all.insert(all.end(), row.arguments.begin(), row.arguments.end());
+    const auto outcome = runProgram(all);
+    EXPECT_EQ(outcome.exitStatus, row.exitStatus) << ::testing::PrintToString(row.arguments) << outcome.output;
+    EXPECT_NE(outcome.output.find(row.inOutput), std::string::npos)
+        << ::testing::PrintToString(row.arguments) << outcome.output;
+}
+
 // Goal: the tool's exit codes and outputs are what scripts rely on. Method: a table of calls on a real daemon.
 TEST(Tool, ExitCodesAndOutput) {
     DaemonProcess daemon;
     daemon.start();
     const std::string root = daemon.root();
-    struct Row {
-        std::vector<std::string> arguments;
-        int exitStatus;
-        const char* inOutput;
-    };
-    const std::vector<Row> rows = {
+    const std::vector<ToolCall> rows = {
         {{"create", "a.b", "--class", "data-app", "--user", "501"}, 0, "a.b created"},
         {{"lookup", "a.b", "--class", "2"}, 0, "a.b exists"},
         {{"--json", "lookup", "a.b", "--class", "Data/Application"}, 0, "\"existed\": true"},
@@ -216,16 +227,36 @@ TEST(Tool, ExitCodesAndOutput) {
         {{"--root", "/nowhere", "status"}, 3, "cannot reach zorvaned"},
         {{"--root", "/nowhere", "--json", "list", "--class", "2"}, 3, "\"unreachable\""},
     };
-    for (const Row& row : rows) {
-        std::vector<std::string> all = {programPath("zorvanectl"), "--root", root};
-        if (!row.arguments.empty() && row.arguments[0] == "--root")
-            all.resize(1);
-        all.insert(all.end(), row.arguments.begin(), row.arguments.end());
-        const auto outcome = runProgram(all);
-        EXPECT_EQ(outcome.exitStatus, row.exitStatus) << ::testing::PrintToString(row.arguments) << outcome.output;
-        EXPECT_NE(outcome.output.find(row.inOutput), std::string::npos)
-            << ::testing::PrintToString(row.arguments) << outcome.output;
-    }
+    for (const ToolCall& row : rows)
+        expectCall(root, row);
+}
+
+// Goal: damage is found, told and mended as promised, with a daemon and without one. Method: a table of calls over a
+// store whose container lost a directory, then over one whose daemon was killed.
+TEST(Tool, ChecksAndRepairs) {
+    DaemonProcess daemon;
+    daemon.start();
+    const std::string root = daemon.root();
+    expectCall(root, {{"create", "a.b", "--class", "data-app", "--user", "501"}, 0, "created"});
+    expectCall(root, {{"--json", "check"}, 0, "\"findings\": []"});
+    const auto found =
+        daemon.client().createOrLookup({.containerClass = dataApplication, .user = 501, .identifier = "a.b"});
+    ASSERT_TRUE(found);
+    const std::string documents = found->path + "/Documents";
+    std::filesystem::remove(documents);
+    expectCall(root, {{"check"}, 4, "subdirectory-missing"});
+    expectCall(root, {{"--json", "check"}, 4, "\"code\": \"subdirectory-missing\""});
+    expectCall(root, {{"check", "--repair", "--dry-run"}, 4, "of a.b in Data/Application are made again"});
+    EXPECT_FALSE(std::filesystem::exists(documents));
+    expectCall(root, {{"check", "--repair"}, 0, "of a.b in Data/Application are made again"});
+    EXPECT_TRUE(std::filesystem::exists(documents));
+    expectCall(root, {{"explain", "subdirectory-missing"}, 0, "Consequence"});
+    expectCall(root, {{"check", "--dry-run"}, 2, "--repair"});
+    expectCall(root, {{"--root", "/nowhere", "--json", "check"}, 3, "\"unreachable\""});
+    daemon.kill();
+    expectCall(root, {{"check"}, 0, "The store is whole"});
+    std::filesystem::remove(documents);
+    expectCall(root, {{"check", "--repair"}, 3, "cannot reach"});
 }
 
 } // namespace zor::whole

@@ -94,7 +94,7 @@ void World::start() {
     platform_ = std::move(*opened);
     lockStateQueue.inner = &platform_->roles().lockStateQueue;
     sandbox.inner = &platform_->roles().sandbox;
-    protection_ = std::make_unique<platform::XattrProtectionClass>(platform_->root(), faults_, lockState);
+    protection_ = std::make_unique<platform::XattrProtectionClass>(faults_, lockState);
     composition_ = std::make_unique<Composition>(withRoles(platform_->roles(), *this), options_.probe);
 }
 

@@ -65,8 +65,17 @@ int protection(const zorvane::ConnectOptions& connect, const Output& output, con
 /// Shows the device's lock state, and sets it before that when one is given.
 int lockState(const zorvane::ConnectOptions& connect, const Output& output, const std::optional<int>& state);
 
+// Check.cc
+struct Checking {
+    /// Have put right what the daemon can, and say what it cannot.
+    bool repair = false;
+    /// Say what a repair would do.
+    bool dryRun = false;
+};
+int check(const zorvane::ConnectOptions& connect, const Output& output, const Checking& checking, Consent consent);
+
 // Explain.cc
-/// One code of the daemon's; empty: all of them.
+/// One code, the daemon's or a finding's; empty: all of them.
 int explain(const Output& output, const std::string& text);
 
 // EntitlementCommands.cc

@@ -1,32 +1,57 @@
 // SPDX-License-Identifier: Apache-2.0
 // What a code means and what to do about it. Asks nobody: it works without a daemon.
 #include "Commands.h"
+#include "check/FindingCode.h"
 #include "zorvane/Error.h"
 
 #include <algorithm>
-#include <charconv>
 #include <cstdio>
 
 namespace zorvanectl {
 
 namespace {
 
-nlohmann::json pageOf(std::uint64_t code) {
-    const zorvane::ErrorText text = zorvane::errorText(code);
-    return {{"code", code}, {"meaning", text.meaning}, {"whatToDo", text.advice}};
+/// What both kinds of code have.
+struct Page {
+    /// A number for the daemon's codes, a word for a check's.
+    nlohmann::json code;
+    std::string name;
+    const char* meaning;
+    const char* cause;
+    const char* consequence;
+    const char* whatToDo;
+};
+
+std::vector<Page> allPages() {
+    std::vector<Page> pages;
+    for (const std::uint64_t code : zorvane::errorCodes()) {
+        const zorvane::ErrorText text = zorvane::errorText(code);
+        pages.push_back({code, std::to_string(code), text.meaning, text.cause, text.consequence, text.advice});
+    }
+    for (const auto& page : zor::check::findingPages())
+        pages.push_back({page.word, std::string(page.word), page.meaning, page.cause, page.consequence, page.whatToDo});
+    return pages;
 }
 
-int listCodes(const Output& output, const std::vector<std::uint64_t>& codes) {
+nlohmann::json toJson(const Page& page) {
+    return {{"code", page.code},
+            {"meaning", page.meaning},
+            {"cause", page.cause},
+            {"consequence", page.consequence},
+            {"whatToDo", page.whatToDo}};
+}
+
+int listPages(const Output& output, const std::vector<Page>& pages) {
     if (output.isJson()) {
-        nlohmann::json pages = nlohmann::json::array();
-        for (const std::uint64_t code : codes)
-            pages.push_back(pageOf(code));
-        output.json(pages);
+        nlohmann::json list = nlohmann::json::array();
+        for (const Page& page : pages)
+            list.push_back(toJson(page));
+        output.json(list);
         return exitDone;
     }
     std::vector<std::vector<std::string>> rows;
-    for (const std::uint64_t code : codes)
-        rows.push_back({std::to_string(code), zorvane::errorText(code).meaning});
+    for (const Page& page : pages)
+        rows.push_back({page.name, page.meaning});
     output.table({"CODE", "MEANING"}, rows);
     return exitDone;
 }
@@ -34,21 +59,22 @@ int listCodes(const Output& output, const std::vector<std::uint64_t>& codes) {
 } // namespace
 
 int explain(const Output& output, const std::string& text) {
-    const std::vector<std::uint64_t> codes = zorvane::errorCodes();
+    const std::vector<Page> pages = allPages();
     if (text.empty())
-        return listCodes(output, codes);
-    std::uint64_t code = 0;
-    const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), code);
-    if (error != std::errc() || end != text.data() + text.size() || !std::ranges::binary_search(codes, code)) {
+        return listPages(output, pages);
+    const auto page = std::ranges::find(pages, text, &Page::name);
+    if (page == pages.end()) {
         std::fprintf(stderr, "zorvanectl: '%s' is no code; 'zorvanectl explain' lists all\n", printable(text).c_str());
         return exitUsage;
     }
     if (output.isJson()) {
-        output.json(pageOf(code));
+        output.json(toJson(*page));
         return exitDone;
     }
-    output.line("code " + text + ": " + zorvane::errorText(code).meaning);
-    output.line("  What to do: " + std::string(zorvane::errorText(code).advice));
+    output.line(page->name + ": " + page->meaning);
+    output.line(std::string("  Cause: ") + page->cause);
+    output.line(std::string("  Consequence: ") + page->consequence);
+    output.line(std::string("  What to do: ") + page->whatToDo);
     return exitDone;
 }
 

@@ -19,6 +19,8 @@ inline constexpr int exitDone = 0;
 inline constexpr int exitDaemonError = 1;
 inline constexpr int exitUsage = 2;
 inline constexpr int exitUnreachable = 3;
+/// A check found something.
+inline constexpr int exitFindings = 4;
 
 enum class Format { people, json };
 

@@ -2,6 +2,7 @@
 // The data-protection class of a container, and the lock that a change of it may wait for.
 #include "Commands.h"
 #include "KnownContainer.h"
+#include "PendingChanges.h"
 #include "platform/FileDescriptor.h"
 #include "platform/linux/FileDeviceLockState.h"
 #include "platform/linux/Names.h"
@@ -33,7 +34,6 @@ namespace {
 
 /// How long an answer may take before it counts as one that comes after the next unlock.
 constexpr std::uint32_t pendingAfterMilliseconds = 1000;
-constexpr int lockStateLocked = 1;
 
 /// A class, or why it cannot be told. The daemon keeps it where a file's owner cannot change it, if it can.
 std::string classOnDisk(int directory) {
@@ -69,24 +69,19 @@ std::map<std::string, std::string> classesOnDisk(const std::string& path) {
     return classes;
 }
 
-/// A change that has not ended, as the status tells it.
-struct Pending {
-    std::int64_t protectionClass = 0;
-    bool locked = false;
-};
-std::optional<Pending> pendingChange(const zorvane::ConnectOptions& connect, const zorvane::Client::Address& address) {
-    const auto answer = zorvane::status(connect);
-    const nlohmann::json status = answer ? toJson(*answer) : nlohmann::json::object();
-    const nlohmann::json counters = status.value("Counters", nlohmann::json::object());
-    for (const auto& change : counters.value("PendingProtectionChanges", nlohmann::json::array()))
-        if (change.value("UUID", "") == zorvane::uuidText(address.uuid))
-            return Pending{.protectionClass = change.value("ProtectionClass", std::int64_t{0}),
-                           .locked = counters.value("LockState", 0) == lockStateLocked};
+/// The change of this container that has not ended.
+std::optional<PendingChange> pendingChange(const zorvane::ConnectOptions& connect,
+                                           const zorvane::Client::Address& address) {
+    const auto status = zorvane::status(connect);
+    if (status)
+        for (const PendingChange& change : pendingChangesIn(*status))
+            if (change.uuid == zorvane::uuidText(address.uuid))
+                return change;
     return std::nullopt;
 }
 
 int showProtection(const Output& output, const zorvane::Client::Address& address, std::int64_t recorded,
-                   const std::map<std::string, std::string>& onDisk, const std::optional<Pending>& pending) {
+                   const std::map<std::string, std::string>& onDisk, const std::optional<PendingChange>& pending) {
     if (output.isJson()) {
         nlohmann::json json = {{"identifier", address.identifier}, {"recorded", recorded}, {"onDisk", onDisk}};
         json["pending"] = pending ? nlohmann::json(pending->protectionClass) : nlohmann::json();
@@ -196,11 +191,11 @@ int lockState(const zorvane::ConnectOptions& connect, const Output& output, cons
             return output.error(unreachable(directory + " cannot be written to", failure), what);
     const int now = FileDeviceLockState(*root).currentState();
     if (output.isJson())
-        output.json({{"lockState", now}, {"locked", now == lockStateLocked}});
+        output.json({{"lockState", now}, {"locked", now == FileDeviceLockState::locked}});
     else
-        output.line(now == 0                 ? "unlocked"
-                    : now == lockStateLocked ? "locked"
-                                             : "neither locked nor unlocked (" + std::to_string(now) + ")");
+        output.line(now == FileDeviceLockState::unlocked ? "unlocked"
+                    : now == FileDeviceLockState::locked ? "locked"
+                                                         : "neither locked nor unlocked (" + std::to_string(now) + ")");
     return exitDone;
 }
 

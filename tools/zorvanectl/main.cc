@@ -20,6 +20,7 @@ Examples:
   zorvanectl entitlements set org.example.notes --app-group group.org.example
   zorvanectl why org.example.notes
   zorvanectl protect org.example.notes 1 --class data-app --third-party
+  zorvanectl check --repair --dry-run
   zorvanectl status
 
 Classes, by number, name, or the beginning of one name in lower case (data-app):
@@ -30,7 +31,7 @@ Classes, by number, name, or the beginning of one name in lower case (data-app):
   13 Shared/SystemGroup
 
 Exit codes: 0 done, 1 the daemon answered with an error, 2 usage,
-3 the daemon cannot be reached or does not answer this program.)";
+3 the daemon cannot be reached or does not answer this program, 4 a check found something.)";
 
 struct Arguments {
     zorvane::ConnectOptions connect;
@@ -47,6 +48,7 @@ struct Arguments {
     Protection protection;
     std::optional<int> lockState;
     std::string code;
+    Checking checking;
 };
 
 /// Accepts what containerClassOf knows, with an error that lists nothing twice: --help does.
@@ -113,9 +115,16 @@ void addContainerCommands(CLI::App& app, Arguments& arguments, Action& action) {
         addTargetOptions(*command, arguments);
     make("empty-death-row", "Delete what waits for deletion, and wait for it",
          [](const Arguments& a, const Output& o) { return zorvanectl::emptyDeathRow(a.connect, o); });
-    make("explain", "Say what a code of the daemon means, and what to do; without one, list them",
+    make("explain", "Say what a code of the daemon's or of a finding means, and what to do; without one, list them",
          [](const Arguments& a, const Output& o) { return zorvanectl::explain(o, a.code); })
-        ->add_option("code", arguments.code, "The number");
+        ->add_option("code", arguments.code, "The number, or the word");
+    CLI::App* check = make(
+        "check", "Judge the store as it lies on the disk; needs no daemon",
+        [](const Arguments& a, const Output& o) { return zorvanectl::check(a.connect, o, a.checking, consentOf(a)); });
+    CLI::Option* repair =
+        check->add_flag("--repair", arguments.checking.repair, "Have the daemon put right what it can");
+    check->add_flag("--dry-run", arguments.checking.dryRun, "Only say what a repair would do")->needs(repair);
+    check->add_flag("-y,--yes", arguments.yes, "Do not ask");
     make("status", "Show whom the daemon takes this program for, and how it is doing",
          [](const Arguments& a, const Output& o) { return zorvanectl::status(a.connect, o); });
 }

@@ -28,9 +28,12 @@ struct Error {
     std::string message;
 };
 
-/// What a code of the daemon means, and what to do about it. Static strings, never null.
+/// What a code of the daemon means, how it comes about, what follows from it, and what to do. Static strings, never
+/// null or empty.
 struct ErrorText {
     const char* meaning;
+    const char* cause;
+    const char* consequence;
     const char* advice;
 };
 [[nodiscard]] ErrorText errorText(std::uint64_t code);

@@ -5,11 +5,10 @@
 #include "platform/linux/DirectoryNames.h"
 #include "platform/linux/Names.h"
 #include "platform/linux/Openat2.h"
+#include "platform/linux/SandboxLinks.h"
 
 #include <cerrno>
-#include <climits>
 #include <fcntl.h>
-#include <unistd.h>
 
 namespace zor::platform {
 
@@ -78,50 +77,16 @@ int LinkSandboxUserState::setMapping(std::uint32_t userId, SandboxItemType type,
 
 unsigned LinkSandboxUserState::removeDanglingMappings() {
     unsigned removed = 0;
-    const auto top = openDirectory(root_.runtimeDirectory(), names::sandboxDirectory, Missing::fail);
-    if (!top)
-        return 0;
-    for (const std::string& user : directoryNames(top->get())) {
-        const auto userDirectory = openDirectory(top->get(), user.c_str(), Missing::fail);
-        if (!userDirectory)
-            continue;
-        for (const std::string& type : directoryNames(userDirectory->get())) {
-            const auto directory = openDirectory(userDirectory->get(), type.c_str(), Missing::fail);
-            if (directory)
-                removed += removeDanglingIn(directory->get());
+    forEachSandboxDirectory(root_, [&](const SandboxDirectory& directory) {
+        for (const std::string& name : directoryNames(directory.descriptor)) {
+            if (isSandboxLeftover(name))
+                (void)disk_.unlinkFile(directory.descriptor, name.c_str());
+            else if (isDanglingSandboxLink(root_, directory.descriptor, name.c_str()) &&
+                     disk_.unlinkFile(directory.descriptor, name.c_str()) == 0)
+                ++removed;
         }
-    }
+    });
     return removed;
-}
-
-unsigned LinkSandboxUserState::removeDanglingIn(int directory) {
-    unsigned removed = 0;
-    for (const std::string& name : directoryNames(directory)) {
-        if (name.front() == '.')
-            (void)disk_.unlinkFile(directory, name.c_str());
-        else if (isDangling(directory, name.c_str()) && disk_.unlinkFile(directory, name.c_str()) == 0)
-            ++removed;
-    }
-    return removed;
-}
-
-bool LinkSandboxUserState::isDangling(int directory, const char* name) const {
-    char buffer[PATH_MAX];
-    const ssize_t bytes = ::readlinkat(directory, name, buffer, sizeof buffer);
-    if (bytes < 0 || bytes == sizeof buffer)
-        return false;
-    const std::string_view target(buffer, static_cast<std::size_t>(bytes));
-    const std::string inRoot = root_.path("/");
-    std::string_view below = target;
-    if (!root_.isDeviceRoot()) {
-        if (!below.starts_with(inRoot))
-            return true;
-        below.remove_prefix(inRoot.size());
-    }
-    if (!below.starts_with('/'))
-        return true;
-    const auto found = openInRoot(root_.descriptor(), std::string(below).c_str(), O_PATH | O_NOFOLLOW);
-    return !found && (found.error() == ENOENT || found.error() == ENOTDIR);
 }
 
 } // namespace zor::platform

@@ -29,8 +29,6 @@ private:
     [[nodiscard]] std::expected<FileDescriptor, int> openDirectory(int parent, const char* name, Missing missing);
     [[nodiscard]] std::expected<FileDescriptor, int> directoryOf(std::uint32_t userId, SandboxItemType type,
                                                                  Missing missing);
-    [[nodiscard]] unsigned removeDanglingIn(int directory);
-    [[nodiscard]] bool isDangling(int directory, const char* name) const;
 
     const SystemRoot& root_;
     Disk& disk_;

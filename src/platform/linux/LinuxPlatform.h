@@ -77,7 +77,7 @@ private:
     LinuxSystemVersionQuery systemVersion_{root_};
     LinuxPasswordDatabase passwords_{root_};
     FileDeviceLockState lockState_{root_};
-    XattrProtectionClass protection_{root_, disk_, lockState_};
+    XattrProtectionClass protection_{disk_, lockState_};
     LinkSandboxUserState sandbox_{root_, disk_};
     FileTerminationAssertionService assertions_{root_, disk_};
     FileCrashAnnotation crash_{root_, disk_};

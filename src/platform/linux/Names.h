@@ -36,6 +36,9 @@ inline constexpr const char* crashFile = "zorvaned.crash";
 
 // POSIX semaphore, followed by "." and a hash of the root unless that is "/".
 inline constexpr const char* bootMarker = "zorvaned.fb_check";
+/// Where the C library keeps a semaphore named X: in the file sem.X there.
+inline constexpr const char* semaphoreDirectory = "/dev/shm";
+inline constexpr const char* semaphoreFilePrefix = "sem.";
 
 // Extended attribute with a data-protection class: the first where the daemon is root.
 inline constexpr const char* protectionAttribute = "trusted.zorvane.protection";

@@ -17,8 +17,6 @@ namespace zor::platform {
 namespace {
 
 constexpr mode_t markerMode = 0400;
-/// Where the C library keeps a semaphore named X: in the file sem.X.
-constexpr const char* semaphoreFilePrefix = "/dev/shm/sem.";
 
 /// FNV-1a, 64 bits. It only keeps roots apart; nothing relies on its being hard to invert.
 std::uint64_t hashOf(std::string_view text) {
@@ -44,7 +42,8 @@ SemaphoreBootMarker::SemaphoreBootMarker(const SystemRoot& root) : name_(nameFor
 
 BootMarker::State SemaphoreBootMarker::look() const {
     struct stat status{};
-    if (::fstatat(AT_FDCWD, (semaphoreFilePrefix + name_).c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0)
+    const std::string file = std::string(names::semaphoreDirectory) + "/" + names::semaphoreFilePrefix + name_;
+    if (::fstatat(AT_FDCWD, file.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0)
         return {};
     // Somebody could give a second name to another semaphore of ours, if that one is open to all.
     const bool ours = S_ISREG(status.st_mode) && status.st_uid == ::geteuid() && status.st_nlink == 1 &&

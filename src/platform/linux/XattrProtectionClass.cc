@@ -1,11 +1,13 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/linux/XattrProtectionClass.h"
 
+#include "platform/FileDescriptor.h"
 #include "platform/linux/Names.h"
 
 #include <cerrno>
 #include <charconv>
 #include <string>
+#include <sys/mman.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
@@ -13,26 +15,25 @@ namespace zor::platform {
 
 namespace {
 
-constexpr int stateLocked = 1;
-
 bool keysGoWithLock(int protectionClass) {
     return protectionClass == 1 || protectionClass == 2;
 }
 
-/// Root inside a container often lacks the right that the trusted namespace asks for.
-const char* chooseAttribute(const SystemRoot& root) {
+/// Root inside a container often lacks the right that the trusted namespace asks for. The right is the process's, not
+/// the file system's, so a file in memory tells, and the disk stays as it is.
+const char* chooseAttribute() {
     if (::geteuid() != 0)
         return names::protectionAttributeUser;
-    if (::fsetxattr(root.runtimeDirectory(), names::protectionAttribute, "0", 1, 0) != 0)
-        return errno == EPERM ? names::protectionAttributeUser : names::protectionAttribute;
-    (void)::fremovexattr(root.runtimeDirectory(), names::protectionAttribute);
-    return names::protectionAttribute;
+    const FileDescriptor probe(::memfd_create("zorvane", MFD_CLOEXEC));
+    const bool refused =
+        probe.valid() && ::fsetxattr(probe.get(), names::protectionAttribute, "0", 1, 0) != 0 && errno == EPERM;
+    return refused ? names::protectionAttributeUser : names::protectionAttribute;
 }
 
 } // namespace
 
-XattrProtectionClass::XattrProtectionClass(const SystemRoot& root, Disk& disk, const DeviceLockState& lockState)
-    : attribute_(chooseAttribute(root)), disk_(disk), lockState_(lockState) {}
+XattrProtectionClass::XattrProtectionClass(Disk& disk, const DeviceLockState& lockState)
+    : attribute_(chooseAttribute()), disk_(disk), lockState_(lockState) {}
 
 std::expected<int, int> XattrProtectionClass::classOf(int fd) const {
     const auto found = classIn(fd, attribute_);
@@ -61,7 +62,7 @@ std::expected<std::optional<int>, int> XattrProtectionClass::classIn(int fd, con
 int XattrProtectionClass::setClass(int fd, int protectionClass) {
     if (protectionClass < 0)
         return EINVAL;
-    if (lockState_.currentState() == stateLocked) {
+    if (lockState_.currentState() == DeviceLockState::locked) {
         const auto current = classOf(fd);
         if (!current)
             return current.error();

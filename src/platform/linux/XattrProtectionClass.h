@@ -9,7 +9,6 @@
 #include "platform/DeviceLockState.h"
 #include "platform/Disk.h"
 #include "platform/FileProtectionClass.h"
-#include "platform/linux/SystemRoot.h"
 
 #include <atomic>
 #include <optional>
@@ -18,9 +17,9 @@ namespace zor::platform {
 
 class XattrProtectionClass final : public FileProtectionClass {
 public:
-    /// Looks once, on the root's runtime directory, whether this process may set attributes that clients cannot: else
-    /// the attribute is one that a file's owner can forge.
-    XattrProtectionClass(const SystemRoot& root, Disk& disk, const DeviceLockState& lockState);
+    /// Looks once whether this process may set attributes that clients cannot: else the attribute is one that a file's
+    /// owner can forge.
+    XattrProtectionClass(Disk& disk, const DeviceLockState& lockState);
 
     /// What an attribute of an open file says; nullopt when it has none (or its file system has none at all). A value
     /// that is no class of ours reads as the default. Else an errno.

@@ -1,0 +1,71 @@
+// SPDX-License-Identifier: Apache-2.0
+// What a check looks at: a system root, and the daemon's own readers over it, on a disk that refuses every change.
+//
+// Opening it makes nothing, takes no lock and asks no daemon. One thread.
+#pragma once
+
+#include "check/ReadOnlyDisk.h"
+#include "daemon/base/Log.h"
+#include "fs/ZORFileManager.h"
+#include "platform/PlatformLog.h"
+#include "platform/linux/FileDeviceLockState.h"
+#include "platform/linux/LinuxPasswordDatabase.h"
+#include "platform/linux/SemaphoreBootMarker.h"
+#include "platform/linux/SystemRoot.h"
+#include "platform/linux/XattrProtectionClass.h"
+#include "store/StorePlaces.h"
+
+#include <expected>
+#include <memory>
+#include <string>
+
+namespace zor::check {
+
+/// Readers say in the log what they cannot read; here the findings say it.
+class SilentLog final : public platform::PlatformLog {
+public:
+    bool open(std::string_view, int) override { return true; }
+    [[nodiscard]] bool isOpen() const override { return true; }
+    [[nodiscard]] int level() const override { return 0; }
+    void enableDiskLogging(const std::string&, unsigned, std::size_t) override {}
+    void write(int, std::string_view, std::string_view) override {}
+    void writeToSystemLog(int, std::string_view) override {}
+};
+
+class CheckedSystem {
+public:
+    /// Else one line that says why this root cannot be checked by this process: only the user that the daemon runs as
+    /// sees what the daemon sees.
+    [[nodiscard]] static std::expected<std::unique_ptr<CheckedSystem>, std::string>
+    open(const std::string& rootDirectory);
+
+    [[nodiscard]] const platform::SystemRoot& root() const { return root_; }
+    [[nodiscard]] const platform::PasswordDatabase& passwords() const { return passwords_; }
+    [[nodiscard]] const platform::BootMarker& bootMarker() const { return bootMarker_; }
+    [[nodiscard]] const platform::FileProtectionClass& protection() const { return protection_; }
+    [[nodiscard]] const Log& log() const { return log_; }
+    [[nodiscard]] ZORFileManager& fileManager() { return fileManager_; }
+    [[nodiscard]] const StorePlaces& places() const { return places_; }
+    /// Whether a daemon serves the root, as far as can be seen from outside.
+    [[nodiscard]] bool daemonRuns() const;
+    /// A daemon that is not root gives nothing to others.
+    [[nodiscard]] bool ownersCount() const;
+    /// Relative to the root, without a leading slash; what lies outside keeps its whole path.
+    [[nodiscard]] std::string belowRoot(const FileURL& url) const;
+
+private:
+    explicit CheckedSystem(platform::SystemRoot root);
+
+    platform::SystemRoot root_;
+    ReadOnlyDisk disk_;
+    SilentLog silence_;
+    Log log_{silence_};
+    platform::LinuxPasswordDatabase passwords_{root_};
+    platform::SemaphoreBootMarker bootMarker_{root_};
+    platform::FileDeviceLockState lockState_{root_};
+    platform::XattrProtectionClass protection_{disk_, lockState_};
+    ZORFileManager fileManager_{log_, root_, disk_, protection_};
+    StorePlaces places_{fileManager_.resolver()};
+};
+
+} // namespace zor::check

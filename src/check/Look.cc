@@ -1,0 +1,90 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "check/Look.h"
+
+#include "daemon/base/UserIdentity.h"
+#include "fs/BulkDirectoryRead.h"
+#include "store/Names.h"
+#include "store/ZORPerUserConfiguration.h"
+
+#include <cerrno>
+#include <sys/stat.h>
+
+namespace zor::check {
+
+Look::Look(CheckedSystem& system, const CheckOptions& options)
+    : system_(system), options_(options), whitelist_(ZORWhitelist::forSystem(system.log(), system.fileManager())) {
+    for (std::uint32_t userId = firstMobileUserId; userId <= lastMobileUserId; ++userId) {
+        auto home = ZORPerUserConfiguration::homeOf(system.passwords(), userId);
+        if (home && system.fileManager().itemExistsAtURL(*home))
+            users_.push_back({userId, std::move(*home)});
+    }
+}
+
+Finding& Look::add(FindingCode code, const FileURL& url, std::string what, Mender mender) {
+    Finding& finding = findings_.emplace_back();
+    finding.code = code;
+    finding.path = system_.belowRoot(url);
+    finding.what = std::move(what);
+    finding.mender = mender;
+    return finding;
+}
+
+Finding& Look::addForPerson(FindingCode code, const FileURL& url, std::string what, std::string command) {
+    Finding& finding = add(code, url, std::move(what), Mender::person);
+    finding.command = std::move(command);
+    return finding;
+}
+
+void Look::addUnexamined(const FileURL& url, int error) {
+    addForPerson(FindingCode::unexamined, url, std::string("cannot be looked at: ") + errorText(error),
+                 "ls -ld " + shellQuoted(url.path()));
+}
+
+void Look::addWrongShape(const FileURL& url) {
+    // The first thing on the way that is no directory is what is wrong; all below it share that.
+    const std::string& path = url.path();
+    const std::size_t rootBytes = system_.root().isDeviceRoot() ? 0 : system_.root().canonicalPath().size();
+    for (std::size_t end = path.find('/', rootBytes + 1);; end = path.find('/', end + 1)) {
+        const FileURL prefix = FileURL::directory(path.substr(0, end));
+        struct stat status{};
+        if (system_.fileManager().resolver().status(prefix, status) == 0 && !S_ISDIR(status.st_mode)) {
+            if (misshapen_.insert(prefix.path()).second)
+                addForPerson(FindingCode::wrongShape, prefix,
+                             S_ISLNK(status.st_mode) ? "is a link where a directory belongs"
+                                                     : "is no directory where one belongs",
+                             moveAside(prefix));
+            return;
+        }
+        if (end == path.npos)
+            return; // it has changed meanwhile
+    }
+}
+
+std::optional<platform::FileDescriptor> Look::openDirectory(const FileURL& url) {
+    auto opened = system_.fileManager().resolver().openDirectory(url);
+    if (opened)
+        return std::move(*opened);
+    if (opened.error() == ELOOP || opened.error() == ENOTDIR)
+        addWrongShape(url);
+    else if (opened.error() != ENOENT)
+        addUnexamined(url, opened.error());
+    return std::nullopt;
+}
+
+void Look::forEachName(int directory, const FileURL& url, const std::function<void(const char*)>& function) {
+    const auto buffer = std::make_unique<fs::BulkDirectoryRead::Buffer>();
+    fs::BulkDirectoryRead entries(directory, *buffer);
+    while (const auto* entry = entries.next())
+        function(entry->name);
+    if (entries.error() != 0)
+        addUnexamined(url, entries.error());
+}
+
+std::string Look::moveAside(const FileURL& url) const {
+    const std::string aside =
+        system_.root().path(names::rootHome) + "/" + std::string(url.lastPathComponent()) + ".aside";
+    return inDirectory(url.deletingLastPathComponent().path(),
+                       "mv -nT -- " + shellQuoted(url.lastPathComponent()) + " " + shellQuoted(aside));
+}
+
+} // namespace zor::check

@@ -1,0 +1,69 @@
+// SPDX-License-Identifier: Apache-2.0
+// One look over a store: what its parts share. Every directory is opened anew, without following a link, and judged by
+// its descriptor.
+#pragma once
+
+#include "check/CheckedSystem.h"
+#include "check/Finding.h"
+#include "check/ShellText.h"
+#include "check/StoreCheck.h"
+#include "entitlements/ZORWhitelist.h"
+#include "platform/FileDescriptor.h"
+
+#include <functional>
+#include <map>
+#include <optional>
+#include <set>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+namespace zor::check {
+
+struct MobileUser {
+    std::uint32_t userId;
+    FileURL home;
+};
+
+class Look {
+public:
+    Look(CheckedSystem& system, const CheckOptions& options);
+
+    [[nodiscard]] CheckedSystem& device() { return system_; }
+    [[nodiscard]] const CheckOptions& options() const { return options_; }
+    [[nodiscard]] const ZORWhitelist& whitelist() const { return whitelist_; }
+    /// Those that have a home.
+    [[nodiscard]] const std::vector<MobileUser>& users() const { return users_; }
+
+    /// Adds a finding and gives it for more to be filled in. `url` is what it is about.
+    Finding& add(FindingCode code, const FileURL& url, std::string what, Mender mender);
+    /// A finding that somebody who may use a shell can mend.
+    Finding& addForPerson(FindingCode code, const FileURL& url, std::string what, std::string command);
+    void addUnexamined(const FileURL& url, int error);
+
+    /// An open directory; nothing when there is none, or when there is something else, which is then a finding.
+    [[nodiscard]] std::optional<platform::FileDescriptor> openDirectory(const FileURL& url);
+    /// Each name in an open directory but "." and "..".
+    void forEachName(int directory, const FileURL& url, const std::function<void(const char* name)>& function);
+
+    /// Moves something aside, within the directory of root, deleting nothing.
+    [[nodiscard]] std::string moveAside(const FileURL& url) const;
+
+    /// The live containers that shared-container rules ask about: identifier to directory, by class and user.
+    std::map<std::pair<ContainerClass, std::uint32_t>, std::map<std::string, FileURL>> sharedContainers;
+
+    [[nodiscard]] std::vector<Finding> take() { return std::move(findings_); }
+
+private:
+    void addWrongShape(const FileURL& url);
+
+    CheckedSystem& system_;
+    const CheckOptions& options_;
+    const ZORWhitelist whitelist_;
+    std::vector<MobileUser> users_;
+    std::vector<Finding> findings_;
+    std::set<std::string> misshapen_;
+};
+
+} // namespace zor::check

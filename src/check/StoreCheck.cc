@@ -1,0 +1,45 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "check/StoreCheck.h"
+
+#include "check/ContainerCheck.h"
+#include "check/Look.h"
+#include "check/ReferenceCheck.h"
+#include "check/WorkCheck.h"
+
+#include <algorithm>
+#include <thread>
+
+namespace zor::check {
+
+namespace {
+
+std::vector<Finding> lookOnce(CheckedSystem& system, const CheckOptions& options) {
+    Look look(system, options);
+    ContainerCheck(look).checkAll();
+    ReferenceCheck(look).checkAll();
+    WorkCheck(look).checkAll();
+    std::vector<Finding> findings = look.take();
+    std::ranges::stable_sort(findings, {}, &Finding::path);
+    return findings;
+}
+
+} // namespace
+
+std::vector<Finding> checkStore(CheckedSystem& system, const CheckOptions& options) {
+    std::vector<Finding> findings = lookOnce(system, options);
+    if (options.pause.count() == 0 || isWhole(findings))
+        return findings;
+    std::this_thread::sleep_for(options.pause);
+    const std::vector<Finding> again = lookOnce(system, options);
+    std::erase_if(findings, [&](const Finding& finding) {
+        const auto [first, last] = std::ranges::equal_range(again, finding.path, {}, &Finding::path);
+        return std::none_of(first, last, [&](const Finding& seen) { return seen.isSameAs(finding); });
+    });
+    return findings;
+}
+
+bool isWhole(const std::vector<Finding>& findings) {
+    return std::ranges::all_of(findings, [](const Finding& finding) { return pageOf(finding.code).isNote; });
+}
+
+} // namespace zor::check

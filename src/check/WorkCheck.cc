@@ -1,0 +1,153 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "check/WorkCheck.h"
+
+#include "fs/AtomicFile.h"
+#include "fs/LeftoverNames.h"
+#include "platform/PercentEncoding.h"
+#include "platform/linux/DirectoryNames.h"
+#include "platform/linux/Names.h"
+#include "platform/linux/SandboxLinks.h"
+#include "store/operations/ReplaceJournal.h"
+
+#include <charconv>
+#include <ctime>
+#include <fcntl.h>
+#include <sys/stat.h>
+
+namespace zor::check {
+
+namespace {
+
+/// A running daemon deletes at its leisure: what came to death row within this time may just not have had its turn.
+constexpr std::time_t leisureSeconds = 600;
+
+/// Whether an item has been there for less than that.
+bool isYoung(int directory, const char* name) {
+    struct stat status{};
+    return ::fstatat(directory, name, &status, AT_SYMLINK_NOFOLLOW) != 0 ||
+           std::time(nullptr) - status.st_mtim.tv_sec < leisureSeconds;
+}
+
+} // namespace
+
+void WorkCheck::checkAll() {
+    checkStaging();
+    checkDeathRow();
+    checkJournals();
+    checkLibrary();
+    checkMappings();
+    checkBootMarker();
+}
+
+void WorkCheck::checkStaging() {
+    const FileURL staging = look_.device().places().stagingDirectory();
+    const auto directory = look_.openDirectory(staging);
+    if (!directory)
+        return;
+    look_.forEachName(directory->get(), staging, [&](const char* name) {
+        if (fs::isCopyLeftover(name))
+            look_.add(FindingCode::copyLeftover, staging.appendingDirectory(name),
+                      "is a copy from another file system that was cut short", Mender::launch);
+        else
+            look_.add(FindingCode::stagingLeftover, staging.appendingDirectory(name),
+                      "was being made or replaced when the daemon stopped", Mender::launch);
+    });
+}
+
+void WorkCheck::checkDeathRow() {
+    const FileURL deathRow = look_.device().places().deathrowDirectory();
+    const auto directory = look_.openDirectory(deathRow);
+    if (!directory)
+        return;
+    look_.forEachName(directory->get(), deathRow, [&](const char* name) {
+        if (look_.options().daemonServes && isYoung(directory->get(), name))
+            return;
+        look_.add(FindingCode::deathRowItem, deathRow.appendingDirectory(name), "waits for its deletion",
+                  Mender::daemon);
+    });
+}
+
+void WorkCheck::checkJournals() {
+    const FileURL replace = look_.device().places().replaceDirectory();
+    const auto directory = look_.openDirectory(replace);
+    if (!directory)
+        return;
+    look_.forEachName(directory->get(), replace, [&](const char* name) {
+        const FileURL url = replace.appendingFile(name);
+        if (fs::isWriteLeftover(name))
+            look_.add(FindingCode::writeLeftover, url, "is a journal whose writing was cut short", Mender::launch);
+        else if (name[0] != '.') // the recovery looks at no other
+            addJournal(url);
+    });
+}
+
+void WorkCheck::addJournal(const FileURL& url) {
+    ZORFileManager& fileManager = look_.device().fileManager();
+    auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(look_.device().log(), fileManager, url);
+    std::string what = "is no journal that can be read; it will be discarded";
+    if (journal) {
+        journal->moveToRoot(look_.device().root().canonicalPath(), look_.device().places().stagingDirectory());
+        if (fileManager.itemExistsAtURL(journal->destUrl))
+            what = "is the journal of a replace that is done, or has not begun";
+        else if (fileManager.itemExistsAtURL(journal->oldUrl))
+            what = "is the journal of a replace that has not begun";
+        else if (fileManager.itemExistsAtURL(journal->stagingUrl))
+            what = "is the journal of a replace that will be undone: its old container waits in staging";
+        else
+            what = "is the journal of a replace of which nothing is left";
+    }
+    look_.add(FindingCode::journalLeftover, url, std::move(what), Mender::launch);
+}
+
+void WorkCheck::checkLibrary() {
+    const FileURL library = look_.device().places().libraryDirectory();
+    const auto directory = look_.openDirectory(library);
+    if (!directory)
+        return;
+    look_.forEachName(directory->get(), library, [&](const char* name) {
+        if (fs::isWriteLeftover(name))
+            look_.add(FindingCode::writeLeftover, library.appendingFile(name), "is a file whose writing was cut short",
+                      Mender::nextWrite);
+    });
+}
+
+void WorkCheck::checkMappings() {
+    const platform::SystemRoot& root = look_.device().root();
+    const FileURL sandbox = FileURL::directory(root.path(platform::names::runtimeDirectory))
+                                .appendingDirectory(platform::names::sandboxDirectory);
+    platform::forEachSandboxDirectory(root, [&](const platform::SandboxDirectory& directory) {
+        const FileURL url = sandbox.appendingDirectory(directory.user).appendingDirectory(directory.itemType);
+        for (const std::string& name : platform::directoryNames(directory.descriptor)) {
+            if (platform::isSandboxLeftover(name)) {
+                look_.add(FindingCode::writeLeftover, url.appendingFile(name),
+                          "is a sandbox mapping whose making was cut short", Mender::launch);
+                continue;
+            }
+            if (!platform::isDanglingSandboxLink(root, directory.descriptor, name.c_str()))
+                continue;
+            Finding& finding = look_.add(FindingCode::mappingDangling, url.appendingFile(name),
+                                         "is a sandbox mapping that leads to no container", Mender::launch);
+            finding.identifier = platform::percentDecode(name).value_or("");
+            std::uint32_t user = 0;
+            const std::string& text = directory.user;
+            if (std::from_chars(text.data(), text.data() + text.size(), user).ec == std::errc())
+                finding.user = user;
+        }
+    });
+}
+
+void WorkCheck::checkBootMarker() {
+    const platform::BootMarker& marker =
+        look_.options().bootMarker ? *look_.options().bootMarker : look_.device().bootMarker();
+    const platform::BootMarker::State state = marker.look();
+    const FileURL url = FileURL::directory(platform::names::semaphoreDirectory)
+                            .appendingFile(platform::names::semaphoreFilePrefix + marker.name());
+    if (state.foreign)
+        look_.add(FindingCode::bootMarkerForeign, url, "is the boot marker's name, and somebody else's file",
+                  Mender::launch);
+    else if (!state.present && look_.options().daemonServes)
+        look_.addForPerson(FindingCode::bootMarkerMissing, url, "is the boot marker, and is missing",
+                           "ls -ld -- " + shellQuoted(platform::names::semaphoreDirectory));
+}
+
+} // namespace zor::check

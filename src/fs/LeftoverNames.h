@@ -1,0 +1,24 @@
+// SPDX-License-Identifier: Apache-2.0
+// Names that only a stop leaves behind. None of them is ever taken for the real thing. What an atomic write leaves is
+// named in AtomicFile.h.
+#pragma once
+
+#include <string_view>
+
+namespace zor::fs {
+
+/// How a copy across file systems is named until it is whole.
+inline constexpr const char* copyPrefix = ".zorvaned-copy-";
+
+[[nodiscard]] inline bool isCopyLeftover(std::string_view name) {
+    return name.starts_with(copyPrefix);
+}
+
+/// Whether `name` is the directory `finalName` on its way to that name.
+[[nodiscard]] inline bool isDirectoryLeftover(std::string_view name, std::string_view finalName) {
+    constexpr std::size_t randomCharacters = 6;
+    return name.size() == finalName.size() + 1 + randomCharacters && name.starts_with(finalName) &&
+           name[finalName.size()] == '.';
+}
+
+} // namespace zor::fs

@@ -1,0 +1,48 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "platform/linux/SandboxLinks.h"
+
+#include "platform/linux/DirectoryNames.h"
+#include "platform/linux/Names.h"
+#include "platform/linux/Openat2.h"
+
+#include <cerrno>
+#include <climits>
+#include <fcntl.h>
+#include <unistd.h>
+
+namespace zor::platform {
+
+void forEachSandboxDirectory(const SystemRoot& root, const std::function<void(const SandboxDirectory&)>& found) {
+    constexpr int flags = O_RDONLY | O_DIRECTORY;
+    const auto top = openBeneath(root.runtimeDirectory(), names::sandboxDirectory, flags);
+    if (!top)
+        return;
+    for (const std::string& user : directoryNames(top->get())) {
+        const auto userDirectory = openBeneath(top->get(), user.c_str(), flags);
+        if (!userDirectory)
+            continue;
+        for (const std::string& itemType : directoryNames(userDirectory->get()))
+            if (const auto directory = openBeneath(userDirectory->get(), itemType.c_str(), flags))
+                found({.descriptor = directory->get(), .user = user, .itemType = itemType});
+    }
+}
+
+bool isDanglingSandboxLink(const SystemRoot& root, int directory, const char* name) {
+    char buffer[PATH_MAX];
+    const ssize_t bytes = ::readlinkat(directory, name, buffer, sizeof buffer);
+    if (bytes < 0 || bytes == sizeof buffer)
+        return false;
+    std::string_view below(buffer, static_cast<std::size_t>(bytes));
+    if (!root.isDeviceRoot()) {
+        const std::string inRoot = root.path("/");
+        if (!below.starts_with(inRoot))
+            return true;
+        below.remove_prefix(inRoot.size());
+    }
+    if (!below.starts_with('/'))
+        return true;
+    const auto found = openInRoot(root.descriptor(), std::string(below).c_str(), O_PATH | O_NOFOLLOW);
+    return !found && (found.error() == ENOENT || found.error() == ENOTDIR);
+}
+
+} // namespace zor::platform

@@ -1,0 +1,29 @@
+// SPDX-License-Identifier: Apache-2.0
+// Reading sandbox mappings as they lie on the disk; who sets them is LinkSandboxUserState. Changes nothing. Any thread.
+#pragma once
+
+#include "platform/linux/SystemRoot.h"
+
+#include <functional>
+#include <string>
+
+namespace zor::platform {
+
+struct SandboxDirectory {
+    /// A real descriptor, open during the call only.
+    int descriptor = -1;
+    /// Names of directories: numbers, unless somebody else made them.
+    std::string user;
+    std::string itemType;
+};
+/// Calls `found` for each directory of mappings. Nothing when there are none; what is no directory is passed over.
+void forEachSandboxDirectory(const SystemRoot& root, const std::function<void(const SandboxDirectory&)>& found);
+
+/// Whether a name is what a stop in the middle of a replacement left.
+[[nodiscard]] inline bool isSandboxLeftover(const std::string& name) {
+    return name.starts_with('.');
+}
+/// Whether the link leads to nothing, or out of the root. False when that cannot be known.
+[[nodiscard]] bool isDanglingSandboxLink(const SystemRoot& root, int directory, const char* name);
+
+} // namespace zor::platform

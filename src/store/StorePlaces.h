@@ -1,0 +1,57 @@
+// SPDX-License-Identifier: Apache-2.0
+// Where everything of the store lies below a system root. Paths are put together here and nothing else: nothing is
+// made, nothing is looked at. Who makes the directories is ZORGlobalConfiguration; who only looks needs no more than
+// this.
+//
+// Immutable after it is made; any thread.
+#pragma once
+
+#include "daemon/base/ContainerClass.h"
+#include "daemon/base/FileURL.h"
+#include "fs/PathResolver.h"
+
+#include <optional>
+
+namespace zor {
+
+class StorePlaces {
+public:
+    explicit StorePlaces(const fs::PathResolver& resolver);
+
+    [[nodiscard]] const FileURL& brevadHomeDirectory() const { return brevadHomeDirectory_; }
+    [[nodiscard]] const FileURL& sharedContainersDirectory() const { return sharedContainersDirectory_; }
+    /// DIR/tmp; the system's.
+    [[nodiscard]] const FileURL& temporaryDirectory() const { return temporaryDirectory_; }
+    [[nodiscard]] FileURL logDirectory() const;
+    [[nodiscard]] FileURL cachesDirectory() const;
+    [[nodiscard]] FileURL libraryDirectory() const;
+    [[nodiscard]] FileURL transientDirectory() const;
+    [[nodiscard]] FileURL transientBundleDirectory() const;
+    [[nodiscard]] FileURL stagingDirectory() const;
+    [[nodiscard]] FileURL deathrowDirectory() const;
+    [[nodiscard]] FileURL replaceDirectory() const;
+    [[nodiscard]] FileURL bundleDirectory() const;
+    [[nodiscard]] FileURL entitlementFile() const;
+    /// What an entitlement file that cannot be read is renamed to.
+    [[nodiscard]] FileURL unreadableEntitlementFile() const;
+    /// Where an older system kept bundle containers, and those of one class.
+    [[nodiscard]] FileURL formerBundleDirectory() const;
+    [[nodiscard]] FileURL formerBundleDirectory(ContainerClass containerClass) const;
+
+    // Of a mobile user with this home.
+    [[nodiscard]] static FileURL userBaseDirectory(const FileURL& home);
+    [[nodiscard]] static FileURL userTransientDirectory(const FileURL& home);
+
+    /// The directory that holds the class's own; absent for a class of users without a home.
+    [[nodiscard]] std::optional<FileURL> baseOfClass(ContainerClass containerClass, bool transient,
+                                                     const std::optional<FileURL>& userHome) const;
+
+private:
+    const FileURL homeDirectory_;
+    const FileURL brevadHomeDirectory_;
+    const FileURL sharedContainersDirectory_;
+    const FileURL temporaryDirectory_;
+    const FileURL formerContainersDirectory_;
+};
+
+} // namespace zor
