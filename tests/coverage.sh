@@ -4,7 +4,7 @@
 # docs/coverage.md against that. Without --write only the tests that the page names are run; with it all of them, or those
 # that match the pattern while the others' recordings are kept, and the page is written anew.
 set -euo pipefail
-build="$1"
+build="$(realpath "$1")"
 write="${2:-}"
 pattern="${3:-}"
 records="$build/coverage"

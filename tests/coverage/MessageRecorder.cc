@@ -18,26 +18,22 @@ namespace {
 constexpr std::size_t slots = 4096;
 constexpr std::size_t lineBytesMax = 1024;
 
-/// Formats are literals: one address, one text. True when it was seen before; with a full table some come twice.
-std::atomic<const char*>* slotOf(const char* format) {
+/// Formats are literals: one address, one text.
+bool isNew(const char* format) {
     static std::array<std::atomic<const char*>, slots> seen;
     const auto first = reinterpret_cast<std::size_t>(format) * 0x9E3779B97F4A7C15U >> 52U;
     for (std::size_t i = 0; i < 16; ++i) {
         std::atomic<const char*>& slot = seen[(first + i) % slots];
         const char* empty = nullptr;
         if (slot.load() == format)
-            return nullptr;
+            return false;
         if (slot.compare_exchange_strong(empty, format))
-            return &slot;
+            return true;
     }
-    return nullptr;
+    return true; // no place left to remember it
 }
 
-void record(const char* format) {
-    const char* file = std::getenv("ZORVANE_MESSAGES");
-    std::atomic<const char*>* slot = file ? slotOf(format) : nullptr;
-    if (!slot)
-        return;
+bool append(const char* file, const char* format) {
     char line[lineBytesMax];
     std::size_t length = 0;
     for (const char* c = format; *c && length + 3 < sizeof line; ++c) {
@@ -47,10 +43,27 @@ void record(const char* format) {
     }
     line[length++] = '\n';
     const int descriptor = ::open(file, O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0666);
-    if (descriptor < 0 || ::write(descriptor, line, length) != static_cast<ssize_t>(length))
-        slot->store(nullptr); // no descriptor, perhaps: the next time it may be recorded
+    const bool written = descriptor >= 0 && ::write(descriptor, line, length) == static_cast<ssize_t>(length);
     if (descriptor >= 0)
         ::close(descriptor);
+    return written;
+}
+
+/// One that was printed when no descriptor was to be had.
+std::atomic<const char*> waiting;
+
+__attribute__((destructor)) void recordWaiting() {
+    const char* file = std::getenv("ZORVANE_MESSAGES");
+    const char* format = waiting.exchange(nullptr);
+    if (file && format && !append(file, format))
+        waiting = format;
+}
+
+void record(const char* format) {
+    const char* file = std::getenv("ZORVANE_MESSAGES");
+    recordWaiting();
+    if (file && isNew(format) && !append(file, format))
+        waiting = format;
 }
 
 } // namespace

@@ -6,6 +6,7 @@
 #include "platform/linux/Names.h"
 #include "support/ProcessResources.h"
 
+#include <algorithm>
 #include <atomic>
 #include <functional>
 
@@ -202,6 +203,17 @@ TEST(IdentityRegistry, IgnoresWhatMayBeForged) {
     EXPECT_EQ(who(*peer), "good");
     EXPECT_EQ(world.registry.snapshot()->entries.size(), 2U);
     EXPECT_TRUE(world.log.take().empty()) << "what was said is not said again";
+    // Files of which none is too large, and all together are.
+    for (int i = 0; i <= 64; ++i) {
+        const std::string name = "zzz" + std::to_string(100 + i) + ".plist";
+        world.test.write(directory + name, "");
+        ASSERT_EQ(::truncate(world.filePath(name).c_str(), RegistryDirectory::fileBytesMax), 0);
+    }
+    world.registry.takeNotices();
+    EXPECT_EQ(who(*peer), "good");
+    EXPECT_TRUE(std::ranges::any_of(world.log.take(), [](const std::string& line) {
+        return line.ends_with(" is ignored: all files together are too large");
+    }));
     // The directory itself.
     ASSERT_EQ(::chmod(world.test.path(names::identityDirectory).c_str(), 0777), 0);
     world.registry.takeNotices();

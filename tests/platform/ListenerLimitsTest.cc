@@ -5,6 +5,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <dirent.h>
@@ -92,6 +93,48 @@ TEST(ListenerLimits, FourThousandNinetySixConnections) {
     // Accepting waits now and then, when the kernel enlarges the table of descriptors.
     EXPECT_LE(world.listener().counters().threadsMost, std::max(2U, std::thread::hardware_concurrency()) + 4);
     clients.clear();
+    EXPECT_TRUE(world.isAtRest());
+}
+
+// Goal: whoever cannot be served is refused with a line, the next is served, and a kind's lines come once a second with
+// the count of those left out. Method: no descriptor to accept with, a peer that nobody knows, replies that no bytes
+// can hold.
+TEST(ListenerLimits, EachRefusalIsSaidOnceASecond) {
+    ListenerWorld world;
+    world.start([](PeerConnection&, ServiceEvent& event) { event.reply->send({{"text", "\xff"}}); });
+    const auto says = [&](const std::string& words) {
+        return eventually([&] {
+            return std::ranges::any_of(world.reports(), [&](const std::string& line) { return line.contains(words); });
+        });
+    };
+    const auto fails = [&] {
+        RawClient client(world.socketPath());
+        EXPECT_TRUE(client.send(numbered(1), 1));
+        EXPECT_TRUE(client.ended());
+    };
+    for (int i = 0; i < 5; ++i)
+        fails();
+    EXPECT_TRUE(says("A reply could not be written: uid " + std::to_string(::geteuid())));
+    std::this_thread::sleep_for(std::chrono::milliseconds(1100));
+    fails();
+    EXPECT_TRUE(says(" more before)"));
+
+    world.identity.knowsPeers = false;
+    EXPECT_TRUE(RawClient(world.socketPath()).ended());
+    EXPECT_TRUE(says("Connection refused, the kernel does not tell the peer: errno "));
+    world.identity.knowsPeers = true;
+
+    FileDescriptor socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    sockaddr_un address{.sun_family = AF_UNIX, .sun_path = {}};
+    world.socketPath().copy(address.sun_path, sizeof address.sun_path - 1);
+    {
+        const DescriptorLimit descriptors;
+        ASSERT_TRUE(descriptors.set(3));
+        ASSERT_EQ(::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+        EXPECT_TRUE(says("Connection refused, out of descriptors or memory: errno 24"));
+    }
+    fails();
+    socket.reset();
     EXPECT_TRUE(world.isAtRest());
 }
 

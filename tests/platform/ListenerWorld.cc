@@ -37,6 +37,8 @@ private:
 } // namespace
 
 std::unique_ptr<Peer> KernelIdentity::peerOfSocket(int socket) {
+    if (!knowsPeers)
+        return nullptr;
     ucred credentials = {};
     socklen_t length = sizeof credentials;
     if (::getsockopt(socket, SOL_SOCKET, SO_PEERCRED, &credentials, &length) != 0)

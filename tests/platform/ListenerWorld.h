@@ -28,6 +28,7 @@ public:
     bool ownsRoot(uid_t) const override { return everybodyOwnsRoot; }
 
     bool everybodyOwnsRoot = true;
+    std::atomic<bool> knowsPeers{true};
     /// Peers that exist; each connection has one until it has ended.
     std::atomic<int> peers{0};
 };

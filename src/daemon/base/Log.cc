@@ -1,8 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/base/Log.h"
 
-#include <cstdio>
-
 namespace zor {
 
 namespace {
@@ -36,30 +34,6 @@ void Log::writeText(int level, const char* function, std::string_view message) c
     if (level <= logLevelError && provokingUserId && refusalGate_ && !refusalGate_(*provokingUserId))
         return;
     sink_.write(level, function, message);
-}
-
-std::string formattedList(const char* format, std::va_list arguments) {
-    std::va_list again;
-    va_copy(again, arguments);
-    char small[512];
-    const int length = std::vsnprintf(small, sizeof small, format, arguments);
-    std::string text;
-    if (length >= 0 && static_cast<std::size_t>(length) < sizeof small) {
-        text.assign(small, static_cast<std::size_t>(length));
-    } else if (length >= 0) {
-        text.resize(static_cast<std::size_t>(length));
-        std::vsnprintf(text.data(), text.size() + 1, format, again);
-    }
-    va_end(again);
-    return text;
-}
-
-std::string formatted(const char* format, ...) {
-    std::va_list arguments;
-    va_start(arguments, format);
-    std::string text = formattedList(format, arguments);
-    va_end(arguments);
-    return text;
 }
 
 Shown::Shown(const std::string& text) : text_(text.c_str()) {

@@ -7,9 +7,9 @@
 // thread.
 #pragma once
 
+#include "platform/Format.h"
 #include "platform/PlatformLog.h"
 
-#include <cstdarg>
 #include <cstdint>
 #include <functional>
 #include <optional>
@@ -56,10 +56,6 @@ private:
     platform::PlatformLog& sink_;
     RefusalGate refusalGate_;
 };
-
-/// Formats into a string.
-std::string formatted(const char* format, ...) __attribute__((format(printf, 1, 2)));
-std::string formattedList(const char* format, std::va_list arguments) __attribute__((format(printf, 1, 0)));
 
 /// What "%s" prints for an object: at most shownBytesMax bytes; an absent one is "(null)". Copies only what it must
 /// cut. Lives as long as the full expression it is written in.

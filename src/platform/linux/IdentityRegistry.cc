@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/linux/IdentityRegistry.h"
 
+#include "platform/Format.h"
 #include "platform/linux/Names.h"
 
 #include <algorithm>
@@ -104,7 +105,7 @@ void IdentityRegistry::look(Read read) {
     RegistryListing listing = directory_.list();
     std::vector<std::string> problems;
     if (!listing.problem.empty())
-        problems.push_back(std::string(names::identityDirectory) + " " + listing.problem);
+        problems.push_back(formatted("%s %s", names::identityDirectory, listing.problem.c_str()));
     std::vector<Registered> entries = readEntries(listing, read, problems);
     for (Registered& registered : entries) {
         watches_.watchExecutable(registered.entry->executable);
@@ -133,14 +134,14 @@ std::vector<IdentityRegistry::Registered> IdentityRegistry::readEntries(const Re
         const bool isAsBefore = entry && before != listing_.files.end() && before->second == stamp;
         const auto bytes = static_cast<std::size_t>(stamp.bytes);
         if (bytes > bytesLeft) {
-            problems.push_back(name + " is ignored: all files together are too large");
+            problems.push_back(formatted("%s is ignored: all files together are too large", name.c_str()));
             continue;
         }
         bytesLeft -= bytes;
         if (read == Read::all || !isAsBefore) {
             auto parsed = directory_.read(listing, name);
             if (!parsed) {
-                problems.push_back(name + " is ignored: " + parsed.error());
+                problems.push_back(formatted("%s is ignored: %s", name.c_str(), parsed.error().c_str()));
                 continue;
             }
             // Who was granted the same keeps the same object.

@@ -1,6 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/linux/ListenerIncidents.h"
 
+#include "platform/Format.h"
+
 #include <chrono>
 #include <string>
 
@@ -8,16 +10,28 @@ namespace zor::platform {
 
 namespace {
 
-constexpr std::array<const char*, listenerIncidentKinds> words = {
-    "Connection refused, too many connections: uid ",
-    "Connection refused, out of descriptors or memory: errno ",
-    "Connection refused, the kernel does not tell the peer: errno ",
-    "Connection ended, bytes came from a process that did not connect: pid ",
-    "Connection ended, it sent something that is no request: pid ",
-    "Connection ended, too many bytes of unfinished requests: uid ",
-    "Connection ended, too many bytes of unread replies: uid ",
-    "A reply could not be written: pid ",
-};
+std::string lineOf(ListenerIncident incident, std::int64_t about) {
+    const auto number = static_cast<long long>(about);
+    switch (incident) {
+    case ListenerIncident::tooManyConnections:
+        return formatted("Connection refused, too many connections: uid %lld", number);
+    case ListenerIncident::outOfDescriptors:
+        return formatted("Connection refused, out of descriptors or memory: errno %lld", number);
+    case ListenerIncident::unknownPeer:
+        return formatted("Connection refused, the kernel does not tell the peer: errno %lld", number);
+    case ListenerIncident::foreignSender:
+        return formatted("Connection ended, bytes came from a process that did not connect: pid %lld", number);
+    case ListenerIncident::brokenFrame:
+        return formatted("Connection ended, it sent something that is no request: pid %lld", number);
+    case ListenerIncident::tooMuchInput:
+        return formatted("Connection ended, too many bytes of unfinished requests: uid %lld", number);
+    case ListenerIncident::tooMuchOutput:
+        return formatted("Connection ended, too many bytes of unread replies: uid %lld", number);
+    case ListenerIncident::unwritableReply:
+        return formatted("A reply could not be written: uid %lld", number);
+    }
+    return {};
+}
 
 std::int64_t secondsNow() {
     const auto now = std::chrono::steady_clock::now().time_since_epoch();
@@ -35,9 +49,9 @@ void ListenerIncidents::happened(ListenerIncident incident, std::int64_t about) 
     if (!report_ || last == now || !kind.toldAtSeconds.compare_exchange_strong(last, now))
         return;
     const std::uint64_t told = kind.countTold.exchange(count);
-    std::string line = words[index] + std::to_string(about);
+    std::string line = lineOf(incident, about);
     if (count > told + 1)
-        line += " (and " + std::to_string(count - told - 1) + " more before)";
+        line += formatted(" (and %llu more before)", static_cast<unsigned long long>(count - told - 1));
     report_(line);
 }
 

@@ -1,12 +1,12 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/linux/RotatingLog.h"
 
+#include "platform/Format.h"
 #include "platform/linux/LogLine.h"
 
 #include <algorithm>
 #include <cerrno>
 #include <climits>
-#include <cstdio>
 #include <cstring>
 #include <fcntl.h>
 #include <poll.h>
@@ -140,10 +140,9 @@ void RotatingLog::writeToFile(const std::string& line) {
         return;
     }
     if (lostUnsaid_ > 0) {
-        char text[160];
-        std::snprintf(text, sizeof text, "%llu log lines were lost: %s", static_cast<unsigned long long>(lostUnsaid_),
-                      ::strerrordesc_np(error_));
-        if (!append(format(LOG_ERR, "log", text))) {
+        if (!append(format(LOG_ERR, "log",
+                           formatted("%llu log lines were lost: %s", static_cast<unsigned long long>(lostUnsaid_),
+                                     ::strerrordesc_np(error_))))) {
             lose();
             return;
         }
