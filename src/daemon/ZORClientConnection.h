@@ -226,6 +226,7 @@ private:
     int orderBetween(const FileURL& changed, const FileURL& next);
     void recoverFromException(const ReplaceProgress& progress);
     std::optional<ZORError> cleanUpReplace(const ReplaceProgress& progress, StartDeletionThread startDeletionThread);
+    Result<void> openDirectories(ReplaceProgress& progress, const FileURL& stagingUrl);
     Result<void> recoverReplace(const FileURL& journalUrl);
     Result<void> applyReplaceJournal(const ReplaceJournal& journal);
 

@@ -63,6 +63,9 @@ public:
     Result<void> copyItemAtURL(const FileURL& source, const FileURL& destination);
     Result<void> copyItemIfExistsAtURL(const FileURL& source, const FileURL& destination);
     Result<void> moveItemAtURL(const FileURL& source, const FileURL& destination);
+    /// The same from and to directories that are open: it needs no descriptor then, unless it has to copy.
+    enum class Moved { byName, byCopy };
+    Result<Moved> moveItem(int fromDirectory, const FileURL& source, int toDirectory, const FileURL& destination);
     Result<void> moveItemIfExistsAtURL(const FileURL& source, const FileURL& destination);
 
     // Walking and listing.

@@ -137,16 +137,25 @@ Result<void> ZORFileManager::_moveItemAtURL(const FileURL& source, const FileURL
         return {};
     const auto from = resolver_.openParent(source);
     const auto to = resolver_.openParent(destination);
-    const int status =
-        !from ? -from.error()
-        : !to ? -to.error()
-              : disk_.rename(from->directory.get(), from->name.c_str(), to->directory.get(), to->name.c_str(), 0);
-    if (status == -EXDEV && from && to)
-        return moveAcrossFileSystems(source, destination);
+    if (!from || !to)
+        return posixError(ZOR_HERE, from ? to.error() : from.error(), "rename of %s to %s failed: %s", source.c_str(),
+                          destination.c_str(), errorText(from ? to.error() : from.error()));
+    TRY(moveItem(from->directory.get(), source, to->directory.get(), destination));
+    return {};
+}
+
+Result<ZORFileManager::Moved> ZORFileManager::moveItem(int fromDirectory, const FileURL& source, int toDirectory,
+                                                       const FileURL& destination) {
+    const int status = disk_.rename(fromDirectory, std::string(source.lastPathComponent()).c_str(), toDirectory,
+                                    std::string(destination.lastPathComponent()).c_str(), 0);
+    if (status == -EXDEV) {
+        TRY(moveAcrossFileSystems(source, destination));
+        return Moved::byCopy;
+    }
     if (status < 0)
         return posixError(ZOR_HERE, -status, "rename of %s to %s failed: %s", source.c_str(), destination.c_str(),
                           errorText(-status));
-    return {};
+    return Moved::byName;
 }
 
 Result<void> ZORFileManager::moveAcrossFileSystems(const FileURL& source, const FileURL& destination) {

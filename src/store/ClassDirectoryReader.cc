@@ -119,8 +119,12 @@ Result<void> ClassDirectoryReader::forEach(const std::function<void(std::shared_
     SharedReading reading(reader, names);
     std::map<std::size_t, ZORError> errors;
     readAll(reading, errors);
-    for (const auto& [index, error] : errors)
+    for (const auto& [index, error] : errors) {
         logError(log_, error);
+        // What this process could not look at may be a container. Taken for none, it would get a double.
+        if (const ZORError* cause = error.underlying(); cause && cause->isOwnShortage())
+            return failed(cause->code());
+    }
     for (auto& record : reading.records)
         if (record)
             found(std::move(record));

@@ -18,12 +18,11 @@ ZORPerUserConfiguration::initWithUserId(std::uint32_t userId, const Log& log, ZO
         log.write(logLevelError, __func__, "userId: %u must be in range", userId);
         return nullptr;
     }
-    std::unique_ptr<ZORPerUserConfiguration> made(new ZORPerUserConfiguration(userId, log, fileManager));
-    made->userHomeDirectory_ = homeOf(passwords, userId);
-    if (!made->userHomeDirectory_)
+    std::unique_ptr<ZORPerUserConfiguration> made(new ZORPerUserConfiguration(userId, log, fileManager, passwords));
+    const auto home = made->userHomeDirectory();
+    if (!home)
         log.write(logLevelError, __func__, "Failed to getpwuid for uid: %u", userId);
-    log.write(logLevelError, __func__, "user home Dir: %s",
-              made->userHomeDirectory_ ? made->userHomeDirectory_->c_str() : "(null)");
+    log.write(logLevelError, __func__, "user home Dir: %s", home ? home->c_str() : "(null)");
     return made;
 }
 
@@ -38,8 +37,16 @@ std::optional<FileURL> ZORPerUserConfiguration::homeOf(const platform::PasswordD
     return FileURL::directory(path ? path : entry->homeDirectory);
 }
 
+std::optional<FileURL> ZORPerUserConfiguration::userHomeDirectory() {
+    const RecursiveMutexLock held(lock_);
+    if (!userHomeDirectory_)
+        userHomeDirectory_ = homeOf(passwords_, userId_);
+    return userHomeDirectory_;
+}
+
 bool ZORPerUserConfiguration::existsUserBaseDirectory() {
-    return userHomeDirectory_ && fileManager_.itemExistsAtURL(*userHomeDirectory_);
+    const auto home = userHomeDirectory();
+    return home && fileManager_.itemExistsAtURL(*home);
 }
 
 void ZORPerUserConfiguration::makeDirectory(const FileURL& url, const char* function, const char* what) {
@@ -51,9 +58,10 @@ void ZORPerUserConfiguration::makeDirectory(const FileURL& url, const char* func
 
 std::optional<FileURL> ZORPerUserConfiguration::userBaseDirectory() {
     const RecursiveMutexLock held(lock_);
-    if (!userHomeDirectory_)
+    const auto home = userHomeDirectory();
+    if (!home)
         return std::nullopt;
-    FileURL url = StorePlaces::userBaseDirectory(*userHomeDirectory_);
+    FileURL url = StorePlaces::userBaseDirectory(*home);
     makeDirectory(url, __func__, "user base");
     return url;
 }

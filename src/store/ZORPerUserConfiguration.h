@@ -28,7 +28,8 @@ public:
                                                        std::uint32_t userId);
 
     [[nodiscard]] std::uint32_t userId() const { return userId_; }
-    [[nodiscard]] const std::optional<FileURL>& userHomeDirectory() const { return userHomeDirectory_; }
+    /// Asked for again as long as there is none: the database may have been out of reach, for want of descriptors say.
+    [[nodiscard]] std::optional<FileURL> userHomeDirectory();
     /// Whether the home exists; makes nothing.
     [[nodiscard]] bool existsUserBaseDirectory();
     std::optional<FileURL> userBaseDirectory();
@@ -37,15 +38,17 @@ public:
     std::optional<FileURL> containerDirectoryURLForContentClass(ContainerClass containerClass, bool transient);
 
 private:
-    ZORPerUserConfiguration(std::uint32_t userId, const Log& log, ZORFileManager& fileManager)
-        : userId_(userId), log_(log), fileManager_(fileManager) {}
+    ZORPerUserConfiguration(std::uint32_t userId, const Log& log, ZORFileManager& fileManager,
+                            const platform::PasswordDatabase& passwords)
+        : userId_(userId), log_(log), fileManager_(fileManager), passwords_(passwords) {}
     void makeDirectory(const FileURL& url, const char* function, const char* what);
 
     const std::uint32_t userId_;
     const Log& log_;
     ZORFileManager& fileManager_;
-    std::optional<FileURL> userHomeDirectory_; // set before the object is shared
+    const platform::PasswordDatabase& passwords_;
     platform::RecursiveMutex lock_;
+    std::optional<FileURL> userHomeDirectory_ ZOR_GUARDED_BY(lock_); // does not change once it is known
 };
 
 } // namespace zor

@@ -178,10 +178,9 @@ bool UpcallServer::lookUp(const ProcessContainersRequest& request, ProcessContai
 std::optional<std::string> UpcallServer::homeDirectoryOf(std::uint32_t personaId) {
     if (personaId == rootPersona)
         return services_.fileManager.resolver().root().path(names::rootHome);
-    const ZORPerUserConfiguration* user = services_.configuration.getPerUserConfigurationForUserId(personaId);
-    if (!user || !user->userHomeDirectory())
-        return std::nullopt;
-    return user->userHomeDirectory()->path();
+    ZORPerUserConfiguration* user = services_.configuration.getPerUserConfigurationForUserId(personaId);
+    const auto home = user ? user->userHomeDirectory() : std::nullopt;
+    return home ? std::optional(home->path()) : std::nullopt;
 }
 
 void UpcallServer::logContainers(const ProcessContainersRequest& request, const ProcessContainers& containers) const {

@@ -2,6 +2,7 @@
 // Creating, finding and listing containers: what a container of each class looks like on disk, what is refused, what a
 // failing disk leaves, and many clients at once.
 #include "plist/Read.h"
+#include "store/FewDescriptors.h"
 #include "world/World.h"
 
 #include <atomic>
@@ -210,6 +211,41 @@ TEST_F(Create, AnInconsistentContainerIsNotMadeAgain) {
     EXPECT_TRUE(ask("com.example").error().is(ErrorCode::cachedContainerWithoutMetadata));
     EXPECT_EQ(world.names(relative(found->path.substr(0, found->path.rfind('/')))).size(), 1U);
     EXPECT_TRUE(listed().empty());
+}
+
+// Goal: a container that cannot be looked at for want of descriptors is not taken for none, which would give it a
+// double, nor is it taken away by halves. Method: with each number of descriptors left, it is asked for by a daemon
+// that knows nothing yet, and deleted.
+TEST_F(Create, AShortageOfDescriptorsHidesNoContainer) {
+    const auto made = ask("org.kept");
+    ASSERT_TRUE(made);
+    const support::FileTree before = support::readTree(made->path);
+    const std::string identifier = "org.kept";
+    bool refused = false;
+    for (rlim_t left = 0; left < 12; ++left) {
+        SCOPED_TRACE(left);
+        world.restart();
+        Result<FoundContainer> found = [&] {
+            const FewDescriptors few(left);
+            return ask("org.kept");
+        }();
+        refused = refused || !found;
+        if (found) {
+            EXPECT_EQ(found->uuid, made->uuid);
+        }
+        const auto again = ask("org.kept");
+        ASSERT_TRUE(again) << again.error().text();
+        EXPECT_EQ(ask("org.kept")->uuid, made->uuid);
+        {
+            const FewDescriptors few(left);
+            (void)world.daemonsClient().deleteContainerForUser(mobile, &identifier, application, false);
+        }
+        if (!world.exists(relative(made->path)))
+            break; // there were enough
+        EXPECT_EQ(support::readTree(made->path).describe(), before.describe());
+    }
+    EXPECT_TRUE(refused);
+    EXPECT_FALSE(world.exists(relative(made->path)));
 }
 
 // Goal: a transient container is never found again, and none stands in the way of the next. Method: create, create

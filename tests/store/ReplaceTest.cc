@@ -2,6 +2,7 @@
 // Replace and wipe: what is swapped, what is refused, what each failing step leaves, and what a launch makes of each
 // state that a stop can leave.
 #include "plist/Binary.h"
+#include "store/FewDescriptors.h"
 #include "world/World.h"
 
 #include <gtest/gtest.h>
@@ -266,6 +267,32 @@ TEST_F(Replace, AnExceptionAnywhereIsAnError) {
         }
         EXPECT_TRUE(nothingIsUnderWay());
     }
+}
+
+// Goal: want of descriptors loses no old container, and leaves nothing that a later launch would bring back. Method: a
+// replace with each number of descriptors left, its outcome deleted, then a launch.
+TEST_F(Replace, WantOfDescriptorsNeitherLosesNorBringsBack) {
+    const std::string identifier = "short";
+    int refused = 0;
+    for (const Preserve preserve : {Preserve::no, Preserve::yes})
+        for (rlim_t left = 0; left < 24; ++left) {
+            SCOPED_TRACE(left);
+            const auto old = make(identifier, false, "old");
+            const auto fresh = make(identifier, true, "new");
+            const auto replaced = [&] {
+                const FewDescriptors few(left);
+                return replace(swap(&old, fresh, preserve));
+            }();
+            refused += !replaced;
+            const auto now = find(identifier);
+            ASSERT_TRUE(now);
+            EXPECT_TRUE(contentOf(*now) == "new" || (!replaced && contentOf(*now) == "old"));
+            ASSERT_TRUE(world.daemonsClient().deleteContainerForUser(mobile, &identifier, application, false));
+            world.restart();
+            world.daemonsClient().containerManagerSetup();
+            EXPECT_FALSE(find(identifier));
+        }
+    EXPECT_GT(refused, 2);
 }
 
 // Goal: each state that a stop can leave becomes one of the two whole ones; a journal that cannot be used harms

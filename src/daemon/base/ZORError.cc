@@ -1,12 +1,17 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/base/ZORError.h"
 
+#include <cerrno>
 #include <cstring>
 
 namespace zor {
 
 std::string ZORError::text() const {
     return formatted("%s %d \"%s\"", domainName(), code_, ZOR_SHOWN(description_));
+}
+
+bool ZORError::isOwnShortage() const {
+    return isPosix(EMFILE) || isPosix(ENFILE) || isPosix(ENOMEM);
 }
 
 void logError(const Log& log, const ZORError& error) {

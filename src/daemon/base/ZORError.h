@@ -39,6 +39,8 @@ public:
         return domain_ == ErrorDomain::zor && code_ == static_cast<int>(code);
     }
     [[nodiscard]] bool isPosix(int number) const { return domain_ == ErrorDomain::posix && code_ == number; }
+    /// This process ran out of descriptors or memory: the error says nothing about the item.
+    [[nodiscard]] bool isOwnShortage() const;
     /// What a client gets as "ReplyError": the code, sign-extended from 32 bits.
     [[nodiscard]] ErrorCode replyCode() const { return static_cast<ErrorCode>(static_cast<std::int64_t>(code_)); }
     /// For a line: domain, code and description, without the cause.

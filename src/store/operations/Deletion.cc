@@ -126,7 +126,9 @@ bool ZORClientConnection::takeAwayForDelete(const FileURL& container, std::vecto
         changed.push_back(deathRow);
         return true;
     }
-    const auto removed = services_.fileManager.removeItemAtURL(container);
+    // What stopped the move would stop the removal too, half-way: then it stays whole.
+    const auto removed =
+        !moved && moved.error().isOwnShortage() ? moved : services_.fileManager.removeItemAtURL(container);
     if (!removed) {
         makeError(services_.log, {stageFunction, __LINE__}, ErrorCode::listForDeletionFailed, &removed.error(),
                   LogFlag::yes, "Failed to delete container at %s: %s", container.c_str(),

@@ -24,6 +24,8 @@
 
 namespace zor {
 
+using platform::FileDescriptor;
+
 /// How far a replace has come; what its clean-up, and the recovery from an exception, go by.
 struct ZORClientConnection::ReplaceProgress {
     std::shared_ptr<ZORMetadata> oldRecord; // nullptr: none is replaced
@@ -35,6 +37,15 @@ struct ZORClientConnection::ReplaceProgress {
     FileURL stagingUrl;                // empty until it is known
     FileURL journalUrl;                // the same
     std::optional<UUID> newUuidBefore; // while the new container's file says the old UUID
+    /// Opened before the first move, so that want of descriptors stops no replace half-way and leaves no journal of one
+    /// that is done: a launch would take it for one to be undone as soon as the new container has gone.
+    struct {
+        FileDescriptor old;
+        FileDescriptor fresh;
+        FileDescriptor staging;
+        FileDescriptor dest;
+        FileDescriptor journals;
+    } directories;
 };
 
 namespace {
@@ -192,6 +203,8 @@ Result<void> ZORClientConnection::moveOldAway(const ReplaceRequest& request, Rep
         if (const auto opened = services_.fileManager.resolver().openDirectory(*url); !opened)
             return oldNotMoved(
                 posixError(here, opened.error(), "open of %s failed: %s", url->c_str(), errorText(opened.error())));
+    if (const auto opened = openDirectories(progress, stagingUrl); !opened)
+        return oldNotMoved(opened.error());
     if (request.preserveOldUuid == PreserveOldUUID::yes) {
         progress.newUuidBefore = progress.newRecord->uuid();
         progress.newRecord->setUuid(progress.oldRecord->uuid());
@@ -207,10 +220,13 @@ Result<void> ZORClientConnection::moveOldAway(const ReplaceRequest& request, Rep
         log.write(logLevelError, replaceFunction, "Failed to write replace file: %s", written.error().text().c_str());
         return written;
     }
-    if (const auto moved = services_.fileManager.moveItemAtURL(progress.oldUrl, progress.stagingUrl); !moved)
+    const auto& directories = progress.directories;
+    const auto moved = services_.fileManager.moveItem(directories.old.get(), progress.oldUrl, directories.staging.get(),
+                                                      progress.stagingUrl);
+    if (!moved)
         return oldNotMoved(moved.error());
-    // A move to another file system is a copy, and does not fail when only the source cannot go: two would be live.
-    if (!services_.fileManager.itemDoesNotExistAtURL(progress.oldUrl))
+    // A copy does not fail when only the source cannot go: two would be live.
+    if (*moved == ZORFileManager::Moved::byCopy && !services_.fileManager.itemDoesNotExistAtURL(progress.oldUrl))
         return oldNotMoved(posixError(here, EBUSY, "%s is still there", progress.oldUrl.c_str()));
     const bool transient = progress.oldWasTransient;
     const auto removed = services_.cache.removeContainerForUser(request.userIdOld, request.classOld,
@@ -220,11 +236,28 @@ Result<void> ZORClientConnection::moveOldAway(const ReplaceRequest& request, Rep
                          "Failed to remove from cache id: %s, class: %ld, transient: %d",
                          ZOR_SHOWN(progress.oldRecord->identifier()), static_cast<long>(request.classOld), transient);
     // Where nothing else keeps the order of two moves, a cut could leave the second one without the first.
-    const int ordered =
-        orderBetween(services_.configuration.stagingDirectory(), progress.destUrl.deletingLastPathComponent());
+    const int ordered = services_.durability.between(directories.staging.get(), directories.dest.get());
     if (ordered < 0)
         return oldNotMoved(
             posixError(here, -ordered, "sync of %s failed: %s", progress.stagingUrl.c_str(), errorText(-ordered)));
+    return {};
+}
+
+Result<void> ZORClientConnection::openDirectories(ReplaceProgress& progress, const FileURL& stagingUrl) {
+    const std::pair<FileDescriptor*, FileURL> wanted[] = {
+        {&progress.directories.old, progress.oldUrl},
+        {&progress.directories.fresh, progress.newUrl},
+        {&progress.directories.staging, stagingUrl},
+        {&progress.directories.dest, progress.destUrl},
+        {&progress.directories.journals, services_.configuration.replaceDirectory().appendingFile("journal")}};
+    for (const auto& [descriptor, url] : wanted) {
+        const FileURL directory = url.deletingLastPathComponent();
+        auto opened = services_.fileManager.resolver().openDirectory(directory);
+        if (!opened)
+            return posixError({replaceFunction, __LINE__}, opened.error(), "open of %s failed: %s", directory.c_str(),
+                              errorText(opened.error()));
+        *descriptor = std::move(*opened);
+    }
     return {};
 }
 
@@ -232,7 +265,15 @@ Result<void> ZORClientConnection::putNewInPlace(const ReplaceRequest& request, R
     const Log& log = services_.log;
     const Here here{replaceFunction, __LINE__};
     ZORMetadata& record = *progress.newRecord;
-    const auto moved = services_.fileManager.moveItemAtURL(progress.newUrl, progress.destUrl);
+    Result<void> moved;
+    if (progress.oldRecord) {
+        const auto renamed = services_.fileManager.moveItem(progress.directories.fresh.get(), progress.newUrl,
+                                                            progress.directories.dest.get(), progress.destUrl);
+        if (!renamed)
+            moved = renamed.error();
+    } else {
+        moved = services_.fileManager.moveItemAtURL(progress.newUrl, progress.destUrl);
+    }
     if (!moved)
         return makeError(log, here, ErrorCode::newNotMovedIntoPlace, &moved.error(), LogFlag::yes,
                          "Failed to replace: %s with: %s at: %s", progress.oldUrl.c_str(), progress.newUrl.c_str(),
@@ -303,8 +344,10 @@ std::optional<ZORError> ZORClientConnection::cleanUpReplace(const ReplaceProgres
         return failed;
     // The moves are on the disk before the journal can be gone. Where that cannot be, it stays for the next launch,
     // which finds what has moved.
+    const auto& directories = progress.directories;
     const FileURL place = progress.destUrl.deletingLastPathComponent();
-    if (const int ordered = orderBetween(place, services_.configuration.replaceDirectory()); ordered < 0) {
+    if (const int ordered = services_.durability.between(directories.dest.get(), directories.journals.get());
+        ordered < 0) {
         const ZORError cause = posixError({replaceFunction, __LINE__}, -ordered, "sync of %s failed: %s", place.c_str(),
                                           errorText(-ordered));
         return makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &cause,
@@ -313,7 +356,9 @@ std::optional<ZORError> ZORClientConnection::cleanUpReplace(const ReplaceProgres
     if (const auto moved = _moveItemAtURLToDeathRow(progress.stagingUrl, StartDeletionThread::no); !moved)
         failed = makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
                            LogFlag::yes, "Failed to remove staging dir: %s", progress.stagingUrl.c_str());
-    if (const auto moved = _moveItemAtURLToDeathRow(progress.journalUrl, startDeletionThread); !moved)
+    const std::string journalName(progress.journalUrl.lastPathComponent());
+    if (const auto moved = _moveItemAtURLToDeathRow(progress.journalUrl, startDeletionThread);
+        !moved && services_.fileManager.disk().unlinkFile(directories.journals.get(), journalName.c_str()) < 0)
         failed = makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
                            LogFlag::yes, "Failed to remove replace file: %s", progress.journalUrl.c_str());
     return failed;
