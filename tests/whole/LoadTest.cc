@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // Many clients at once, some of which die, and an owner of the trees who moves things about.
-#include "whole/DaemonProcess.h"
+#include "process/DaemonProcess.h"
 
 #include <algorithm>
 #include <atomic>

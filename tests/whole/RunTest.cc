@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // zorvane-run as a service manager uses it: a real daemon, real containers, real sandboxes. What makes sandboxes needs
 // root, and a kernel that allows namespaces here.
-#include "whole/DaemonProcess.h"
+#include "process/DaemonProcess.h"
 
 #include <csignal>
 #include <fcntl.h>

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "whole/DaemonProcess.h"
+#include "process/DaemonProcess.h"
 
 #include "platform/linux/SemaphoreBootMarker.h"
 #include "platform/linux/SystemRoot.h"

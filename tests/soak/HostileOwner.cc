@@ -1,0 +1,153 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "soak/HostileOwner.h"
+
+#include "support/FileTree.h"
+
+#include <filesystem>
+#include <fstream>
+#include <sys/stat.h>
+#include <thread>
+
+namespace zor::soak {
+
+namespace {
+
+namespace files = std::filesystem;
+
+constexpr std::uint64_t dataApplication = 2;
+
+/// Where the second user's containers lie and what leads there, at every depth.
+std::vector<std::string> victimsBelow(const std::string& home) {
+    std::vector<std::string> victims = {home + "Containers", home + "Containers/Data",
+                                        home + "Containers/Data/Application"};
+    std::error_code error;
+    for (files::recursive_directory_iterator at(home + "Containers", error), end; !error && at != end;
+         at.increment(error)) {
+        victims.push_back(at->path());
+        if (at.depth() >= 4 || at->is_symlink(error))
+            at.disable_recursion_pending();
+    }
+    return victims;
+}
+
+} // namespace
+
+HostileOwner::HostileOwner(Session& session, std::uint64_t seed)
+    : session_(session), asking_(seed, 1000), swapping_(seed, 1001), outside_(session.root() + "/outside") {
+    files::create_directories(outside_ + "/Data/Application/tmp");
+    std::ofstream(outside_ + "/file") << "untouched";
+    std::ofstream(outside_ + "/Data/Application/.com.veltra.zorvane.metadata.plist") << "untouched";
+    before_ = support::readTree(outside_).describe();
+}
+
+std::string HostileOwner::changedOutside() const {
+    const std::string now = support::readTree(outside_).describe();
+    return now == before_ ? "" : before_ + "\nbecame\n" + now;
+}
+
+void HostileOwner::ask() {
+    std::optional<zorvane::Client> client;
+    while (!session_.stopped) {
+        if (!client) {
+            auto connected = zorvane::Client::connect(session_.daemon().connection());
+            if (connected)
+                client.emplace(std::move(*connected));
+            else
+                std::this_thread::sleep_for(std::chrono::milliseconds(2));
+            continue;
+        }
+        const std::string identifier = "org.hostile." + std::to_string(asking_.upTo(4));
+        const auto made = client->createOrLookup({.containerClass = dataApplication,
+                                                  .user = hostileUser,
+                                                  .identifier = identifier,
+                                                  .create = true,
+                                                  .transient = asking_.oneIn(3)});
+        session_.did("hostile", "hostile request", identifier);
+        zorvane::Result<void> last;
+        if (made) {
+            const zorvane::Client::Address address{dataApplication, hostileUser, identifier, made->uuid};
+            switch (asking_.upTo(7)) {
+            case 0:
+                last = client->wipe(dataApplication, hostileUser, identifier);
+                break;
+            case 1:
+                last = client->recreateDefaultStructure(address);
+                break;
+            case 2:
+                last = client->regenerateDirectoryUUID(address);
+                break;
+            case 3:
+                if (const auto size = client->diskUsage(address); !size)
+                    last = std::unexpected(size.error());
+                break;
+            case 4:
+                last = client->stageForDelete({address});
+                break;
+            case 5:
+                last = client->setInfoValue(address, "k", zorvane::Value{std::string("v")});
+                break;
+            default:
+                last = client->setDataProtection({.containerClass = dataApplication,
+                                                  .user = hostileUser,
+                                                  .identifier = identifier,
+                                                  .protectionClass = asking_.oneIn(2) ? 1 : 3});
+            }
+        } else {
+            last = std::unexpected(made.error());
+        }
+        if (last)
+            continue;
+        if (last.error().kind == zorvane::Error::Kind::timedOut)
+            session_.found("the hostile owner gets no answer: " + last.error().message);
+        if (last.error().kind != zorvane::Error::Kind::daemon)
+            client.reset();
+    }
+}
+
+void HostileOwner::swapOnce(const std::string& victim) {
+    std::error_code error;
+    // Not through a link that it put there itself: this thread may change what lies outside.
+    if (files::canonical(victim, error) != victim)
+        return;
+    const std::string aside = victim + ".aside";
+    switch (swapping_.upTo(5)) {
+    case 0: // a link in its place for a moment
+        files::rename(victim, aside, error);
+        if (error)
+            return;
+        files::create_symlink(outside_ + "/Data/Application", victim, error);
+        break;
+    case 1: // a pipe
+        files::rename(victim, aside, error);
+        if (error)
+            return;
+        ::mkfifo(victim.c_str(), 0666);
+        break;
+    case 2: // gone for a moment
+        files::rename(victim, aside, error);
+        break;
+    case 3: // a second name of what lies outside
+        if (files::canonical(victim + "/tmp", error) == victim + "/tmp")
+            files::create_hard_link(outside_ + "/file", victim + "/tmp/" + std::to_string(swapping_.upTo(9)), error);
+        return;
+    default:
+        files::remove_all(victim, error);
+        return;
+    }
+    std::this_thread::sleep_for(std::chrono::microseconds(swapping_.upTo(3000)));
+    // What the daemon has made there meanwhile goes, or stays under another name.
+    if (!files::is_directory(files::symlink_status(victim, error)))
+        files::remove(victim, error);
+    files::rename(aside, victim, error);
+}
+
+void HostileOwner::swap() {
+    while (!session_.stopped) {
+        const auto victims = victimsBelow(session_.root() + "/" + hostileHome);
+        for (unsigned i = 0; i < 8 && !session_.stopped; ++i)
+            swapOnce(victims[swapping_.upTo(victims.size())]);
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    }
+}
+
+} // namespace zor::soak

@@ -1,0 +1,35 @@
+// SPDX-License-Identifier: Apache-2.0
+// The second user: a client that asks for containers of its own, and meanwhile puts links and pipes in the places of
+// what the daemon works on, so that it would change what lies outside. Any answer will do, as long as there is one;
+// what lies outside stays as it is.
+#pragma once
+
+#include "soak/Choices.h"
+#include "soak/Session.h"
+
+namespace zor::soak {
+
+inline constexpr std::uint32_t hostileUser = 502;
+/// Below the root: what is found there is the owner's own doing.
+inline constexpr const char* hostileHome = "private/var/second/";
+
+class HostileOwner {
+public:
+    HostileOwner(Session& session, std::uint64_t seed);
+    /// Two threads' work, until the session is stopped.
+    void ask();
+    void swap();
+    /// What changed outside; empty when nothing did.
+    [[nodiscard]] std::string changedOutside() const;
+
+private:
+    void swapOnce(const std::string& victim);
+
+    Session& session_;
+    Choices asking_;
+    Choices swapping_;
+    const std::string outside_;
+    std::string before_;
+};
+
+} // namespace zor::soak

@@ -1,0 +1,155 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "soak/Surroundings.h"
+
+#include "soak/HostileOwner.h"
+
+#include <fstream>
+#include <nlohmann/json.hpp>
+#include <set>
+#include <sys/resource.h>
+#include <thread>
+#include <unistd.h>
+
+namespace zor::soak {
+
+namespace {
+
+void sleepMilliseconds(std::uint64_t milliseconds) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(milliseconds));
+}
+
+/// What may be found of a store in use: clients take directories away, a kill comes amid a change of the protection
+/// class, errors leave what the next start clears.
+bool isAllowed(const nlohmann::json& finding) {
+    static const std::set<std::string> clearedByItself = {"launch", "boot", "next-write", "none"};
+    static const std::set<std::string> codes = {"subdirectory-missing", "subdirectory-attributes", "protection-differs",
+                                                "directory-leftover"};
+    return finding.value("path", "").starts_with(hostileHome) || codes.contains(finding.value("code", "")) ||
+           clearedByItself.contains(finding.at("repair").value("by", ""));
+}
+
+} // namespace
+
+Surroundings::Surroundings(Session& session, std::uint64_t seed, bool diskCanBeFilled)
+    : session_(session), choices_(seed, 2000), diskCanBeFilled_(diskCanBeFilled) {}
+
+void Surroundings::happen(unsigned pauseMillisecondsMax) {
+    sleepMilliseconds(1 + choices_.upTo(pauseMillisecondsMax));
+    const auto lot = choices_.upTo(100);
+    if (lot < 70)
+        kill();
+    else if (lot < 78)
+        boot();
+    else if (lot < 90)
+        lock(!session_.locked);
+    else if (lot < 95 && diskCanBeFilled_)
+        fillDisk();
+    else
+        starve();
+}
+
+void Surroundings::kill() {
+    session_.did("device", "kill", "");
+    whole::DaemonProcess& daemon = session_.daemon();
+    if (choices_.oneIn(10)) {
+        if (const int status = daemon.terminate(); status != 0)
+            session_.found("an orderly end gives exit status " + std::to_string(status));
+    } else {
+        daemon.kill();
+    }
+    ++kills_;
+    daemon.start();
+    if (choices_.oneIn(4))
+        check();
+}
+
+void Surroundings::boot() {
+    session_.did("device", "boot", "");
+    session_.daemon().kill();
+    ++kills_;
+    ++boots_;
+    session_.daemon().start({"--forget-boot"});
+    check();
+}
+
+void Surroundings::lock(bool locked) {
+    const std::unique_lock silence(session_.requests);
+    const auto outcome = whole::runProgram(
+        {whole::programPath("zorvanectl"), "--root", session_.root(), "lock-state", locked ? "1" : "0"});
+    if (outcome.exitStatus != 0)
+        session_.found("lock-state: " + outcome.output);
+    session_.locked = locked;
+}
+
+void Surroundings::enter(Trouble trouble) {
+    const std::unique_lock silence(session_.requests);
+    session_.trouble = trouble;
+}
+
+void Surroundings::fillDisk() {
+    enter(Trouble::diskFull);
+    session_.did("device", "full disk", "");
+    const std::string filler = session_.root() + "/filler";
+    {
+        std::ofstream file(filler, std::ios::binary);
+        const std::string block(1 << 16, 'x');
+        while (file.write(block.data(), static_cast<std::streamsize>(block.size())).flush()) {
+        }
+    }
+    sleepMilliseconds(100 + choices_.upTo(300));
+    if (choices_.oneIn(2)) {
+        session_.did("device", "kill", "");
+        session_.daemon().kill();
+        ++kills_;
+        ::unlink(filler.c_str());
+        session_.daemon().start();
+    }
+    ::unlink(filler.c_str());
+    enter(Trouble::none);
+    session_.did("device", "room again", "");
+}
+
+void Surroundings::starve() {
+    enter(Trouble::fewDescriptors);
+    session_.did("device", "few descriptors", "");
+    const pid_t pid = session_.daemon().pid();
+    rlimit before{};
+    ::prlimit(pid, RLIMIT_NOFILE, nullptr, &before);
+    const rlimit few{session_.daemon().descriptors() + choices_.upTo(4), before.rlim_max};
+    ::prlimit(pid, RLIMIT_NOFILE, &few, nullptr);
+    sleepMilliseconds(50 + choices_.upTo(200));
+    ::prlimit(pid, RLIMIT_NOFILE, &before, nullptr);
+    enter(Trouble::none);
+    session_.did("device", "descriptors again", "");
+}
+
+void Surroundings::settle() {
+    if (session_.locked)
+        lock(false);
+}
+
+void Surroundings::check() {
+    const std::unique_lock silence(session_.requests);
+    const auto outcome =
+        whole::runProgram({whole::programPath("zorvanectl"), "--root", session_.root(), "--json", "check"});
+    session_.did("device", "check", "");
+    const auto document = nlohmann::json::parse(outcome.output, nullptr, false);
+    if (document.is_discarded() || !document.contains("findings")) {
+        session_.found("check says: " + outcome.output);
+        return;
+    }
+    for (const auto& finding : document.at("findings"))
+        if (!isAllowed(finding))
+            session_.found("check finds " + finding.dump());
+}
+
+Surroundings::Size Surroundings::size() const {
+    std::ifstream file("/proc/" + std::to_string(session_.daemon().pid()) + "/status");
+    Size size{.residentKiB = 0, .descriptors = session_.daemon().descriptors()};
+    for (std::string line; std::getline(file, line);)
+        if (line.starts_with("VmRSS:"))
+            size.residentKiB = std::stoul(line.substr(6));
+    return size;
+}
+
+} // namespace zor::soak
