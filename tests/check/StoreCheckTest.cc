@@ -306,7 +306,7 @@ TEST(StoreCheckTest, ReportsNothingOfWhatIsInFlight) {
     for (int i = 0; i < 2; ++i)
         threads.emplace_back([&, i] {
             const std::string identifier = "org.busy" + std::to_string(i);
-            for (int round = 0; !stop; ++round) {
+            while (!stop) {
                 store.create(identifier, ContainerClass::dataApplication, 501);
                 (void)store.world.daemonsClient().deleteDataContainerContentForUser(501, &identifier,
                                                                                     ContainerClass::dataApplication);

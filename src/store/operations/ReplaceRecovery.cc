@@ -118,8 +118,7 @@ Result<void> ZORClientConnection::applyReplaceJournal(const ReplaceJournal& jour
     const State* const state = stateOf(services_.fileManager, journal);
     if (!state)
         return failed(nullptr);
-    log.write(logLevelNotice, recoverFunction, "A replace of %s had stopped: %s", journal.oldUrl.c_str(),
-              state->label);
+    log.write(logLevelNotice, recoverFunction, "A replace of %s had stopped: %s", journal.oldUrl.c_str(), state->label);
     if (state->recovery == Recovery::nothing)
         return {};
     if (log.writes(logLevelDebug))
