@@ -90,6 +90,14 @@ int CopyAttributes::copy(int from, int to, const struct stat& status, mode_t mod
     return disk_.setTimes(to, status.st_atim, status.st_mtim);
 }
 
+int CopyAttributes::giveBasic(int to, const struct stat& status, mode_t mode) {
+    if (const int result = disk_.changeOwner(to, status.st_uid, status.st_gid); result < 0)
+        return result;
+    if (const int result = disk_.changeMode(to, mode); result < 0)
+        return result;
+    return disk_.setTimes(to, status.st_atim, status.st_mtim);
+}
+
 /// Takes an access control list away that the copy inherited and the source does not have.
 int CopyAttributes::dropInheritedAcl(int from, int to, mode_t mode) {
     if (::fgetxattr(to, accessAcl, nullptr, 0) <= 0 || ::fgetxattr(from, accessAcl, nullptr, 0) > 0)

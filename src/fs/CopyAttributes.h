@@ -19,6 +19,8 @@ public:
 
     /// Both are open files or directories; `status` is of `from`, `mode` what the copy gets. 0 or -errno.
     int copy(int from, int to, const struct stat& status, mode_t mode);
+    /// Owner, group, mode and times alone. 0 or -errno.
+    int giveBasic(int to, const struct stat& status, mode_t mode);
     /// A new directory takes over the default access control list of the one it is made in, and its content would in
     /// turn.
     int dropInheritedDefaultAcl(int directory);

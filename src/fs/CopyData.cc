@@ -27,6 +27,8 @@ int CopyData::copy(int from, int to, const struct stat& status) {
         return 0;
     if (!cloneRefused_) {
         const int cloned = disk_.cloneData(from, to);
+        if (cloned == 0)
+            return tell(status.st_size);
         if (!refused(cloned))
             return cloned;
         // EINVAL may be about this one file.
@@ -69,6 +71,8 @@ off_t CopyData::copyRun(int from, int to, off_t bytes) {
                 disk_.copyData(from, to, static_cast<std::size_t>(std::min(bytes - copied, kernelCopyBytesMax)));
             if (count > 0) {
                 copied += count;
+                if (const int told = tell(count); told < 0)
+                    return told;
                 continue;
             }
             if (count < 0 && !refused(count))
@@ -86,6 +90,8 @@ off_t CopyData::copyRun(int from, int to, off_t bytes) {
         if (const int written = disk_.write(to, std::span(buffer_).first(static_cast<std::size_t>(count))); written < 0)
             return written;
         copied += count;
+        if (const int told = tell(count); told < 0)
+            return told;
     }
     return copied;
 }

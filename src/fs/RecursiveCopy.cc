@@ -30,6 +30,8 @@ namespace {
 constexpr mode_t permissionBits = 07777;
 /// What a copied file keeps of its mode: set-user-ID and set-group-ID are not copied.
 constexpr mode_t filePermissionBits = 01777;
+/// What content keeps of it.
+constexpr mode_t accessBits = 0777;
 
 /// The ways in which a file system, or a limit of it, says that a second link cannot be.
 bool linkImpossible(int result) {
@@ -62,12 +64,17 @@ class Copier {
 public:
     Copier(platform::Disk& disk, int toDirectory, const char* to)
         : disk_(disk), attributes_(disk), data_(disk), toDirectory_(toDirectory), to_(to) {}
+    /// Of content, into `toDirectory` itself.
+    Copier(platform::Disk& disk, int toDirectory, const ContentRules& rules)
+        : disk_(disk), attributes_(disk), data_(disk, rules.copied), toDirectory_(toDirectory), to_("."),
+          rules_(&rules) {}
 
     int copy(int fromDirectory, const char* from);
 
 private:
     int visit(const WalkEntry& entry);
     int beginDirectory(const WalkEntry& entry);
+    int enter(FileDescriptor directory, const WalkEntry& entry);
     int endDirectory(const WalkEntry& entry);
     int copyFile(const WalkEntry& entry);
     int copyFileAs(const FileDescriptor& source, const struct stat& status, const WalkEntry& entry);
@@ -75,6 +82,7 @@ private:
     int copyOther(const WalkEntry& entry);
     int finishUnopened(const WalkEntry& entry, mode_t type);
     int openLinks();
+    int finish(int from, int to, struct stat status, mode_t permissions);
     [[nodiscard]] int destinationParent() const { return destination_.empty() ? toDirectory_ : destination_.top(); }
     [[nodiscard]] const char* destinationName(const WalkEntry& entry) const {
         return entry.depth == 0 ? to_ : entry.name;
@@ -85,6 +93,8 @@ private:
     CopyData data_;
     const int toDirectory_;
     const char* const to_;
+    /// nullptr: everything comes along.
+    const ContentRules* const rules_ = nullptr;
     DirectoryStack destination_;
     /// Of the source's directory of each level, from before it was read.
     std::vector<timespec> accessTimes_;
@@ -97,6 +107,8 @@ int Copier::copy(int fromDirectory, const char* from) {
     TreeWalker walker(WalkStatus::full);
     const int result = walker.walk(fromDirectory, from, [&](const WalkEntry& entry) {
         firstError = visit(entry);
+        if (firstError != 0 && rules_)
+            rules_->failed(entry, firstError);
         return firstError == 0 ? WalkStep::proceed : WalkStep::stop;
     });
     if (firstError != 0)
@@ -115,6 +127,10 @@ int Copier::visit(const WalkEntry& entry) {
     // The walk dropped levels that were moved away: what was copied of them is not whole.
     if (destination_.depth() != entry.depth + (leaving ? 1 : 0))
         return -ESTALE;
+    // A link is asked about once its target is known.
+    if (rules_ && entry.depth > 0 && !leaving && entry.kind != WalkEntryKind::symbolicLink)
+        if (const int refused = rules_->admit(entry, nullptr); refused < 0)
+            return refused;
     switch (entry.kind) {
     case WalkEntryKind::directory:
         // One that could not be opened is told as unreadable next.
@@ -131,6 +147,8 @@ int Copier::visit(const WalkEntry& entry) {
 }
 
 int Copier::beginDirectory(const WalkEntry& entry) {
+    if (entry.depth == 0 && rules_)
+        return enter(FileDescriptor(::fcntl(toDirectory_, F_DUPFD_CLOEXEC, 0)), entry);
     const char* const name = destinationName(entry);
     const int parent = destinationParent();
     if (const int made = disk_.makeDirectory(parent, name, 0700); made < 0)
@@ -138,16 +156,20 @@ int Copier::beginDirectory(const WalkEntry& entry) {
     auto directory = platform::openBeneathOnMount(parent, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!directory)
         return -directory.error();
+    return enter(std::move(*directory), entry);
+}
+
+int Copier::enter(FileDescriptor directory, const WalkEntry& entry) {
     if (entry.depth == 0) {
-        if (!isFreshDirectory(directory->get()))
+        if (!isFreshDirectory(directory.get()))
             return -ESTALE;
-        if (const int result = attributes_.dropInheritedDefaultAcl(directory->get()); result < 0)
+        if (const int result = attributes_.dropInheritedDefaultAcl(directory.get()); result < 0)
             return result;
     }
     struct stat status{};
-    if (::fstat(directory->get(), &status) != 0)
+    if (::fstat(directory.get(), &status) != 0)
         return -errno;
-    destination_.push(std::move(*directory), status.st_dev, status.st_ino, name);
+    destination_.push(std::move(directory), status.st_dev, status.st_ino, destinationName(entry));
     accessTimes_.push_back(entry.status.st_atim);
     return 0;
 }
@@ -164,7 +186,11 @@ int Copier::endDirectory(const WalkEntry& entry) {
         return -ESTALE;
     struct stat status = entry.status;
     status.st_atim = accessTimes_.back();
-    const int result = attributes_.copy(entry.directory, destination_.top(), status, status.st_mode & permissionBits);
+    // The root of a content's copy is the caller's.
+    const int result = rules_ && entry.depth == 0
+                           ? 0
+                           : finish(entry.directory, destination_.top(), status,
+                                    rules_ ? (status.st_mode & accessBits) | S_IRWXU : status.st_mode & permissionBits);
     if (result == 0) {
         destination_.pop();
         accessTimes_.pop_back();
@@ -205,7 +231,15 @@ int Copier::copyFileAs(const FileDescriptor& source, const struct stat& status, 
         return file.get();
     if (const int copied = data_.copy(source.get(), file.get(), status); copied < 0)
         return copied;
-    return attributes_.copy(source.get(), file.get(), status, status.st_mode & filePermissionBits);
+    return finish(source.get(), file.get(), status, status.st_mode & (rules_ ? accessBits : filePermissionBits));
+}
+
+int Copier::finish(int from, int to, struct stat status, mode_t permissions) {
+    if (!rules_)
+        return attributes_.copy(from, to, status, permissions);
+    status.st_uid = rules_->owner;
+    status.st_gid = rules_->group;
+    return attributes_.giveBasic(to, status, permissions);
 }
 
 int Copier::copyLink(const WalkEntry& entry) {
@@ -218,6 +252,9 @@ int Copier::copyLink(const WalkEntry& entry) {
     if (static_cast<std::size_t>(length) == target.size())
         return -ENAMETOOLONG;
     target[static_cast<std::size_t>(length)] = '\0';
+    if (rules_)
+        if (const int refused = rules_->admit(entry, target.data()); refused < 0)
+            return refused;
     const int made = disk_.makeSymbolicLink(target.data(), destinationParent(), destinationName(entry));
     return made < 0 ? made : finishUnopened(entry, S_IFLNK);
 }
@@ -240,7 +277,9 @@ int Copier::finishUnopened(const WalkEntry& entry, mode_t type) {
         return -errno;
     if ((status.st_mode & S_IFMT) != type || status.st_uid != ::geteuid())
         return -ESTALE;
-    if (const int owned = disk_.changeOwner(item.get(), entry.status.st_uid, entry.status.st_gid); owned < 0)
+    const int owned = rules_ ? disk_.changeOwner(item.get(), rules_->owner, rules_->group)
+                             : disk_.changeOwner(item.get(), entry.status.st_uid, entry.status.st_gid);
+    if (owned < 0)
         return owned;
     if (type != S_IFLNK)
         if (const int moded = disk_.changeMode(item.get(), entry.status.st_mode & filePermissionBits); moded < 0)
@@ -272,6 +311,10 @@ int Copier::openLinks() {
 
 int copyTree(platform::Disk& disk, int fromDirectory, const char* from, int toDirectory, const char* to) {
     return Copier(disk, toDirectory, to).copy(fromDirectory, from);
+}
+
+int copyContent(platform::Disk& disk, int from, int to, const ContentRules& rules) {
+    return Copier(disk, to, rules).copy(from, ".");
 }
 
 } // namespace zor::fs

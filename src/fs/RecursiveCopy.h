@@ -23,11 +23,34 @@
 // thread.
 #pragma once
 
+#include "fs/TreeWalker.h"
 #include "platform/Disk.h"
+
+#include <cstdint>
+#include <functional>
+#include <sys/types.h>
 
 namespace zor::fs {
 
 /// 0, or -errno. -EEXIST when the destination exists, -ENOENT when the source does not.
 int copyTree(platform::Disk& disk, int fromDirectory, const char* from, int toDirectory, const char* to);
+
+/// How the content of a directory is copied to become somebody's: whose, and what may come along.
+struct ContentRules {
+    uid_t owner = 0;
+    gid_t group = 0;
+    /// Asked about each item before it is copied; of a symbolic link with its target. Not 0, a -errno, ends the copy.
+    std::function<int(const WalkEntry& entry, const char* linkTarget)> admit;
+    /// Told of each piece of a file that was copied; the same.
+    std::function<int(std::uint64_t bytes)> copied;
+    /// Told of the item at which the copy ended.
+    std::function<void(const WalkEntry& entry, int error)> failed;
+};
+
+/// Copies everything below the open directory `from` into the open directory `to`, which is empty and closed to others,
+/// and stays so. As copyTree, but owner and group are those of the rules, no attributes and access control lists come
+/// along, of modes no more than the bits for access, and a directory's owner may always use it. All of `rules` is
+/// required. 0, or -errno.
+int copyContent(platform::Disk& disk, int from, int to, const ContentRules& rules);
 
 } // namespace zor::fs

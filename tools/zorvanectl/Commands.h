@@ -3,6 +3,7 @@
 #pragma once
 
 #include "Output.h"
+#include "ProgressDisplay.h"
 #include "zorvane/Client.h"
 
 #include <cstdint>
@@ -49,6 +50,16 @@ int infoSet(const zorvane::ConnectOptions& connect, const Output& output, const 
             const std::string& value);
 int infoUnset(const zorvane::ConnectOptions& connect, const Output& output, const Target& target,
               const std::string& key);
+
+// InstallCommand.cc
+struct InstallOptions {
+    /// An archive or a directory.
+    std::string source;
+    ProgressForm progress = ProgressForm::none;
+};
+/// Makes it the content of a container, in the place of the one that is there.
+int install(const zorvane::ConnectOptions& connect, const Output& output, const Target& target,
+            const InstallOptions& options, Consent consent);
 
 // ProtectionCommands.cc
 struct Protection {

@@ -149,6 +149,19 @@ int Output::error(const zorvane::Error& error, const std::string& while_) const 
     return exitCode;
 }
 
+int Output::localError(int exitCode, const std::string& message, const std::string& advice,
+                       const std::string& while_) const {
+    if (isJson()) {
+        const nlohmann::json document = {
+            {"error", {{"kind", "local"}, {"message", message}, {"advice", advice}, {"while", while_}}}};
+        std::fprintf(stderr, "%s\n", dumped(document).c_str());
+    } else {
+        std::fprintf(stderr, "zorvanectl: %s: %s\n  What to do: %s.\n", printable(while_).c_str(), message.c_str(),
+                     advice.c_str());
+    }
+    return exitCode;
+}
+
 std::optional<zorvane::Value> fromJson(const nlohmann::json& json) {
     zorvane::Value value;
     if (json.is_boolean()) {

@@ -21,6 +21,7 @@ inline constexpr int exitUsage = 2;
 inline constexpr int exitUnreachable = 3;
 /// A check found something.
 inline constexpr int exitFindings = 4;
+inline constexpr int exitLocalError = 5;
 
 enum class Format { people, json };
 
@@ -40,6 +41,9 @@ public:
     [[nodiscard]] bool agreed(const std::string& question) const;
     /// Says what failed, what that means and what to do. The exit code for it.
     [[nodiscard]] int error(const zorvane::Error& error, const std::string& while_) const;
+    /// The same for what failed on this side; `exitCode` is the one for it.
+    [[nodiscard]] int localError(int exitCode, const std::string& message, const std::string& advice,
+                                 const std::string& while_) const;
 
 private:
     const Format format_;

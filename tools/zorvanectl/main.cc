@@ -6,6 +6,7 @@
 
 #include <CLI/CLI.hpp>
 #include <functional>
+#include <unistd.h>
 
 namespace {
 
@@ -16,6 +17,7 @@ Examples:
   zorvanectl create org.example.notes --class data-app
   zorvanectl lookup org.example.notes --class 2 --user 501 --json
   zorvanectl list --class Bundle/Application
+  zorvanectl install org.example.notes --class bundle-app notes.tar.zst
   zorvanectl delete org.example.notes org.example.maps --class data-app
   zorvanectl entitlements set org.example.notes --app-group group.org.example
   zorvanectl why org.example.notes
@@ -31,7 +33,8 @@ Classes, by number, name, or the beginning of one name in lower case (data-app):
   13 Shared/SystemGroup
 
 Exit codes: 0 done, 1 the daemon answered with an error, 2 usage,
-3 the daemon cannot be reached or does not answer this program, 4 a check found something.)";
+3 the daemon cannot be reached or does not answer this program, 4 a check found something,
+5 something failed on this side: an archive that is refused, a full disk.)";
 
 struct Arguments {
     zorvane::ConnectOptions connect;
@@ -49,6 +52,8 @@ struct Arguments {
     std::optional<int> lockState;
     std::string code;
     Checking checking;
+    InstallOptions install;
+    std::string progress;
 };
 
 /// Accepts what containerClassOf knows, with an error that lists nothing twice: --help does.
@@ -56,12 +61,16 @@ std::string checkClass(const std::string& text) {
     return zorvane::containerClassOf(text) ? "" : "'" + text + "' is no class; see zorvanectl --help";
 }
 
-void addTargetOptions(CLI::App& command, Arguments& arguments) {
+void addClassAndUser(CLI::App& command, Arguments& arguments) {
     command.add_option("-c,--class", arguments.className, "Class, by name or number")
         ->required()
         ->check(CLI::Validator(checkClass, "CLASS"));
     command.add_option("-u,--user", arguments.user,
                        "User id; 1 is the current mobile user. Without it, the class's usual owner");
+}
+
+void addTargetOptions(CLI::App& command, Arguments& arguments) {
+    addClassAndUser(command, arguments);
     command.add_flag("--transient", arguments.target.transient,
                      "A container that lasts until it is asked for again, or the next boot");
 }
@@ -173,6 +182,35 @@ void addKnownContainerCommands(CLI::App& app, Arguments& arguments, Action& acti
     set->add_option("value", arguments.value, "JSON; what is none is taken as a string")->required();
 }
 
+/// Drawn for people who look on, unless something else is asked for.
+ProgressForm progressFormOf(const std::string& text, bool json) {
+    if (text == "json")
+        return ProgressForm::json;
+    const bool wanted = text == "bar" || (text.empty() && !json && ::isatty(STDERR_FILENO) != 0);
+    return wanted ? ProgressForm::bar : ProgressForm::none;
+}
+
+void addInstallCommand(CLI::App& app, Arguments& arguments, Action& action) {
+    CLI::App* command = addCommand(app, arguments, action, "install",
+                                   "Make an archive or a directory the content of a bundle or data container",
+                                   [](const Arguments& a, const Output& o) {
+                                       const InstallOptions options{.source = a.install.source,
+                                                                    .progress = progressFormOf(a.progress, o.isJson())};
+                                       return zorvanectl::install(a.connect, o, a.target, options, consentOf(a));
+                                   });
+    command->add_option("identifier", arguments.target.identifier, "Identifier")->required();
+    command
+        ->add_option("source", arguments.install.source,
+                     "Archive (tar, zip, cpio, 7-Zip; compressed or not) or directory")
+        ->required();
+    addClassAndUser(*command, arguments);
+    command->add_flag("-y,--yes", arguments.yes, "Do not ask");
+    command
+        ->add_option("--progress", arguments.progress,
+                     "On standard error: bar, json (a line now and then), none; a bar on a terminal if not given")
+        ->check(CLI::IsMember({"bar", "json", "none"}));
+}
+
 void addProtectionCommands(CLI::App& app, Arguments& arguments, Action& action) {
     Protection& protection = arguments.protection;
     const auto make = [&](const char* name, const char* help, Run run) {
@@ -274,6 +312,7 @@ int main(int argumentCount, char** argumentValues) {
     app.footer(footer);
     addContainerCommands(app, arguments, action);
     addKnownContainerCommands(app, arguments, action);
+    addInstallCommand(app, arguments, action);
     addProtectionCommands(app, arguments, action);
     addEntitlementCommands(app, arguments, action);
     addGroupCommands(app, arguments, action);

@@ -1,0 +1,550 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "content/Content.h"
+#include "archives/ArchiveMaker.h"
+#include "content/ItemRules.h"
+#include "content/Unpacker.h"
+#include "platform/linux/LinuxDisk.h"
+#include "support/FaultLoop.h"
+#include "support/FileTree.h"
+#include "support/PowerCut.h"
+#include "support/ProcessResources.h"
+
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <cstring>
+#include <fcntl.h>
+#include <filesystem>
+#include <fstream>
+#include <memory>
+#include <sstream>
+#include <sys/mount.h>
+#include <sys/socket.h>
+#include <sys/sysmacros.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <thread>
+#include <unistd.h>
+
+namespace zorvanectl::content::test {
+namespace {
+
+using zor::platform::FileDescriptor;
+
+using namespace zor::test;
+constexpr const char* metadata = ".com.veltra.zorvane.metadata.plist";
+constexpr uid_t ownerId = 501;
+
+volatile std::sig_atomic_t noSignal = 0;
+
+void writeFile(const std::string& path, const std::string& bytes) {
+    std::ofstream(path, std::ios::binary) << bytes;
+}
+
+std::string repeated(const std::string& text, int count) {
+    std::string whole;
+    for (int i = 0; i < count; ++i)
+        whole += text;
+    return whole;
+}
+
+/// A container as it was just made, and something beside it that nobody may touch.
+class World {
+public:
+    explicit World(const std::string& parent = "/dev/shm") : directory_(parent) {
+        for (const char* name : {"/outside", "/container", "/container/Documents", "/source"})
+            ::mkdir(path(name).c_str(), 0755);
+        writeFile(path("/outside/file"), "SECRET");
+        writeFile(path("/container/") + metadata, "whose it is");
+        if (::geteuid() == 0) {
+            for (const char* name : {"/container", "/container/Documents"})
+                EXPECT_EQ(::chown(path(name).c_str(), ownerId, ownerId), 0);
+        }
+        ::chmod(directory_.path().c_str(), 0755);
+        outside_ = outside();
+    }
+
+    [[nodiscard]] std::string path(const std::string& below) const { return directory_.path() + below; }
+    /// Everything but the container and the source.
+    [[nodiscard]] std::string outside() const {
+        return zor::support::readTree(directory_.path(), {"container", "source", "archive"}).describe();
+    }
+    [[nodiscard]] bool isDamaged() const { return outside() != outside_; }
+    [[nodiscard]] std::string content() const {
+        return zor::support::readTree(path("/container"), {metadata}).describe();
+    }
+
+    Outcome<Progress> put(const std::string& source) {
+        zor::platform::LinuxDisk disk(zor::platform::Syncs::off);
+        return put(source, disk);
+    }
+    Outcome<Progress> put(const std::string& source, zor::platform::Disk& disk) {
+        const FileDescriptor container(::open(path("/container").c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+        auto opened = Source::open(path(source));
+        if (!opened)
+            return std::unexpected(opened.error());
+        return putContent(disk, container.get(), *opened, {}, noSignal);
+    }
+    Outcome<Progress> putArchive(const std::string& bytes) {
+        writeFile(path("/archive"), bytes);
+        return put("/archive");
+    }
+
+private:
+    zor::support::TemporaryDirectory directory_;
+    std::string outside_;
+};
+
+/// Nothing of what was refused shows in the container, and nothing outside it changed.
+void expectRefused(World& world, const std::string& before, const Outcome<Progress>& outcome, const std::string& why) {
+    ASSERT_FALSE(outcome);
+    EXPECT_NE(outcome.error().what.find(why), std::string::npos) << outcome.error().what;
+    EXPECT_FALSE(world.isDamaged());
+    std::string now;
+    std::istringstream lines(world.content());
+    for (std::string line; std::getline(lines, line);)
+        if (line.find(".install-") == line.npos) // closed to the container's owner
+            now += line + "\n";
+    EXPECT_EQ(now, before);
+}
+
+// Goal: no archive makes root write outside the container, give powers, or leave half of itself in sight. Method: a
+// table of archives, each refused with its reason; the tree around the container stays as it was.
+TEST(Content, HostileArchives) {
+    const std::string name255(255, 'n');
+    struct Row {
+        std::vector<Made> entries;
+        const char* why;
+        Form form = Form::tar;
+    };
+    const std::vector<Row> rows = {
+        {{file("/outside/file")}, "absolute"},
+        {{file("../outside/file")}, "leads up"},
+        {{file("a/../../outside/file")}, "leads up"},
+        {{directory("a/..")}, "leads up"},
+        {{file("../outside/file")}, "leads up", Form::zip},
+        {{file("../outside/file")}, "leads up", Form::cpio},
+        {{file("../outside/file")}, "leads up", Form::sevenZip},
+        {{file(metadata)}, "metadata"},
+        {{file("./" + std::string(metadata))}, "metadata"},
+        {{file(std::string(metadata) + "/x")}, "metadata"},
+        {{directory("a"), symbolicLink(metadata, "a")}, "metadata"},
+        {{file("a", "x", 04755)}, "set-user-ID"},
+        {{file("a", "x", 02755)}, "set-group-ID"},
+        {{file("a", "x", 04755)}, "set-user-ID", Form::zip},
+        {{{.name = "a", .mode = S_IFCHR | 0666}}, "a device"},
+        {{{.name = "a", .mode = S_IFBLK | 0666}}, "a device"},
+        {{{.name = "a", .mode = S_IFIFO | 0666}}, "a FIFO"},
+        {{{.name = "a", .mode = S_IFSOCK | 0666}}, "a socket", Form::cpio},
+        {{symbolicLink("a", "/outside")}, "absolute path"},
+        {{symbolicLink("a", "../outside")}, "leads out"},
+        {{directory("a"), symbolicLink("a/b", "../../outside")}, "leads out"},
+        {{symbolicLink("a", "/outside")}, "absolute path", Form::zip},
+        // The first link leads nowhere but here, so ".." behind it would lead out.
+        {{symbolicLink("here", "."), symbolicLink("out", "here/../outside")}, "behind a name"},
+        {{directory("d"), symbolicLink("l", "d"), file("l/f")}, "no directory"},
+        {{symbolicLink("l", "."), directory("l")}, "comes twice"},
+        {{symbolicLink("l", "f"), file("l")}, "comes twice"},
+        {{file("f"), file("f", "y")}, "comes twice"},
+        {{file("f"), file("./f", "y")}, "comes twice"},
+        {{file("f"), directory("f")}, "comes twice"},
+        {{directory("f"), file("f")}, "comes twice"},
+        {{file("f"), file("f/g")}, "no directory"},
+        {{hardLink("a", "/outside/file")}, "leads out"},
+        {{hardLink("a", "../outside/file")}, "leads out"},
+        {{hardLink("a", "b"), file("b")}, "no file earlier"},
+        {{symbolicLink("l", "f"), hardLink("a", "l")}, "no file earlier"},
+        {{directory("d"), hardLink("a", "d")}, "no file earlier"},
+        {{hardLink("a", metadata)}, "no file earlier"},
+        {{file(name255 + "n")}, "more than 255"},
+        {{file(repeated("dir/", 1100) + "f")}, "more than 4095"},
+        {{file(".")}, "only be a directory"},
+        {{hardLink("./", "f")}, "only be a directory"},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(::testing::PrintToString(static_cast<int>(row.form)) + " " + row.entries.back().name + " -> " +
+                     row.entries.back().target + ": " + row.why);
+        World world;
+        const std::string before = world.content();
+        expectRefused(world, before, world.putArchive(makeArchive(row.form, row.entries)), row.why);
+    }
+}
+
+// Goal: what is no archive, is cut or is damaged is refused, wherever that is. Method: such bytes, and a good archive
+// cut after every block and at odd places.
+TEST(Content, BrokenArchives) {
+    std::string noise;
+    for (int i = 0; i < 20'000; ++i)
+        noise += static_cast<char>((i * i * 7919) >> 5);
+    const std::vector<Made> entries = {directory("a"), file("a/f", std::string(3000, 'f')), file("g", noise)};
+    struct Row {
+        std::string what;
+        std::string bytes;
+    };
+    std::vector<Row> rows = {{"nothing", ""},
+                             {"text", "Just some text.\n"},
+                             // A list of files that a reader would fetch.
+                             {"mtree", "#mtree\na type=file contents=/etc/passwd\n"}};
+    for (const auto& [name, form] : std::initializer_list<std::pair<std::string, Form>>{{"tar", Form::tar},
+                                                                                        {"tar.gz", Form::tarGzip},
+                                                                                        {"tar.xz", Form::tarXz},
+                                                                                        {"tar.zst", Form::tarZstd},
+                                                                                        {"zip", Form::zip},
+                                                                                        {"cpio", Form::cpio},
+                                                                                        {"7z", Form::sevenZip}}) {
+        const std::string whole = makeArchive(form, entries);
+        // A tar's end is its last two blocks; of those one may be missing.
+        for (std::size_t cut = 512; form == Form::tar && cut + 1024 < whole.size(); cut += 512)
+            rows.push_back({name + " cut at " + std::to_string(cut), whole.substr(0, cut)});
+        for (std::size_t cut = 16; cut + 16 < whole.size(); cut += whole.size() / 9)
+            rows.push_back({name + " cut at " + std::to_string(cut), whole.substr(0, cut)});
+        std::string damaged = whole;
+        damaged[damaged.size() / 2] ^= 0x55;
+        // The others have no sums of data, or none when they are made this way.
+        if (form != Form::tar && form != Form::cpio && form != Form::tarZstd)
+            rows.push_back({name + " damaged", damaged});
+    }
+    const zor::support::ProcessResources before;
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.what);
+        World world;
+        const std::string empty = world.content();
+        expectRefused(world, empty, world.putArchive(row.bytes), "");
+    }
+    const std::string member = makeArchive(Form::tarGzip, entries);
+    World world; // as two that were put one behind the other, and padded
+    EXPECT_TRUE(world.putArchive(member + std::string("\x1f\x8b\x08\0\0\0\0\0\0\3\3\0\0\0\0\0\0\0\0\0\0\0", 22)));
+    EXPECT_EQ(before.leakedSince(), "");
+}
+
+// Goal: what is good comes in whole, whatever it is packed in, with the container's owner. Method: one tree in every
+// form that can hold it, with names that people would not choose.
+TEST(Content, GoodArchives) {
+    std::string large;
+    for (int i = 0; i < 3'000'000; ++i)
+        large += static_cast<char>(i * 31 >> 3);
+    const std::string longName = repeated(std::string(120, 'l') + "/", 3) + "f";
+    for (const Form form :
+         {Form::tar, Form::gnuTar, Form::tarGzip, Form::tarXz, Form::tarZstd, Form::zip, Form::cpio, Form::sevenZip}) {
+        SCOPED_TRACE(static_cast<int>(form));
+        const bool isTar = form != Form::zip && form != Form::cpio && form != Form::sevenZip;
+        std::vector<Made> entries = {directory("."),
+                                     directory("./a", 0500),
+                                     file("./a/f", "text", 0444),
+                                     directory("./a", 0500),
+                                     file("implied/b/run", "#!", 0755),
+                                     symbolicLink("implied/up", "../../implied/b/../b/run"),
+                                     file("large", large),
+                                     file("empty", ""),
+                                     symbolicLink("Library", "a"),
+                                     file("Documents/n\n\x01", "x")};
+        entries[5].target = "../a/f";
+        if (isTar) {
+            entries.push_back(hardLink("./again", "./a/f"));
+            entries.push_back(file("\xff\xfe", "no text"));
+            entries.push_back(symbolicLink("longLink", longName));
+            entries.push_back(file(longName, "long"));
+        }
+        if (form == Form::tar)
+            entries.push_back({.name = "sparse", .data = "end", .hole = 40'000'000});
+        World world;
+        const auto outcome = world.putArchive(makeArchive(form, entries));
+        ASSERT_TRUE(outcome) << outcome.error().what;
+        EXPECT_FALSE(world.isDamaged());
+        const std::string root = world.path("/container/");
+        const auto read = [&](const std::string& name) {
+            std::ifstream stream(root + name, std::ios::binary);
+            return std::string(std::istreambuf_iterator<char>(stream), {});
+        };
+        EXPECT_EQ(read("a/f"), "text");
+        EXPECT_TRUE(read("large") == large);
+        EXPECT_EQ(read("implied/up"), "text");
+        EXPECT_EQ(read("Library/f"), "text");
+        EXPECT_EQ(read("Documents/n\n\x01"), "x");
+        EXPECT_EQ(read(metadata), "whose it is");
+        struct stat status{};
+        ASSERT_EQ(::lstat((root + "a").c_str(), &status), 0);
+        EXPECT_EQ(status.st_mode & 07777, 0700U) << "its owner may use each of the directories";
+        ASSERT_EQ(::lstat((root + "a/f").c_str(), &status), 0);
+        EXPECT_EQ(status.st_mode & 07777, 0444U);
+        EXPECT_EQ(status.st_mtime, 1'000'000'000);
+        EXPECT_EQ(status.st_nlink, isTar ? 2U : 1U);
+        ASSERT_EQ(::lstat((root + "empty").c_str(), &status), 0);
+        EXPECT_EQ(status.st_size, 0);
+        if (isTar) {
+            EXPECT_EQ(read("again"), "text");
+            EXPECT_EQ(read("\xff\xfe"), "no text");
+            EXPECT_EQ(read("longLink"), "long");
+        }
+        if (form == Form::tar) {
+            EXPECT_TRUE(read("sparse") == std::string(40'000'000, '\0') + "end");
+            ASSERT_EQ(::lstat((root + "sparse").c_str(), &status), 0);
+            EXPECT_LT(status.st_blocks * 512, 1'000'000) << "a hole stays one";
+        }
+        for (const auto& [id, inode] : zor::support::readTree(world.path("/container"), {metadata}).inodes)
+            EXPECT_EQ(inode.uid, ::geteuid() == 0 ? ownerId : ::geteuid());
+    }
+}
+
+// Goal: a directory as the source is judged like an archive. Method: one wrong item in it, deep enough to be met late.
+TEST(Content, HostileDirectories) {
+    struct Row {
+        const char* what;
+        std::function<void(const std::string& folder)> make;
+        const char* why;
+        bool rootOnly = false;
+    };
+    const std::vector<Row> rows = {
+        {"set-user-ID",
+         [](const std::string& folder) {
+             writeFile(folder + "/x", "x");
+             ::chmod((folder + "/x").c_str(), 04755);
+         },
+         "set-user-ID"},
+        {"FIFO", [](const std::string& folder) { ::mkfifo((folder + "/x").c_str(), 0600); }, "a FIFO"},
+        {"device", [](const std::string& folder) { ::mknod((folder + "/x").c_str(), S_IFCHR | 0666, makedev(1, 3)); },
+         "a device", true},
+        {"link out", [](const std::string& folder) { (void)!::symlink("../../../x", (folder + "/x").c_str()); },
+         "leads out"},
+        {"metadata", [](const std::string& folder) { writeFile(folder + "/../../" + metadata, "forged"); }, "metadata"},
+        {"mount", [](const std::string& folder) { ::mount("none", folder.c_str(), "tmpfs", 0, ""); },
+         "another file system", true},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.what);
+        if (row.rootOnly && ::geteuid() != 0)
+            continue;
+        World world;
+        const std::string before = world.content();
+        for (const char* folder : {"/source/a", "/source/a/b"})
+            ::mkdir(world.path(folder).c_str(), 0755);
+        row.make(world.path("/source/a/b"));
+        expectRefused(world, before, world.put("/source"), row.why);
+        ::umount2(world.path("/source/a/b").c_str(), MNT_DETACH);
+    }
+    World world;
+    const std::string before = world.content();
+    expectRefused(world, before, world.put(""), "holds the container itself");
+}
+
+// Goal: a directory comes in as it is, but as the container's. Method: what may be in one, compared item by item.
+TEST(Content, GoodDirectories) {
+    World world;
+    const std::string root = world.path("/source");
+    for (const char* folder : {"/a", "/a/b", "/Documents"})
+        ::mkdir((root + folder).c_str(), 0755);
+    writeFile(root + "/a/b/f", std::string(100'000, 'f'));
+    writeFile(root + "/Documents/\n", "x");
+    ASSERT_EQ(::link((root + "/a/b/f").c_str(), (root + "/again").c_str()), 0);
+    ASSERT_EQ(::symlink("../Documents", (root + "/a/l").c_str()), 0);
+    ASSERT_EQ(::truncate((root + "/a/b/f").c_str(), 50'000'000), 0);
+    const auto outcome = world.put("/source");
+    ASSERT_TRUE(outcome) << outcome.error().what;
+    EXPECT_EQ(outcome->items, 7U);
+    EXPECT_FALSE(world.isDamaged());
+    const auto describe = [](const std::string& path) {
+        auto tree = zor::support::readTree(path, {metadata});
+        for (auto& [id, inode] : tree.inodes)
+            inode.uid = inode.gid = 0;
+        return tree.describe();
+    };
+    EXPECT_EQ(describe(world.path("/container")), describe(root));
+    struct stat status{};
+    ASSERT_EQ(::lstat(world.path("/container/again").c_str(), &status), 0);
+    EXPECT_LT(status.st_blocks * 512, 1'000'000) << "a hole stays one";
+    if (::geteuid() == 0) {
+        EXPECT_EQ(status.st_uid, ownerId);
+    }
+}
+
+// Goal: whatever a decoder that was taken over sends, the writer stays in its directory and ends. Method: records that
+// no decoder of ours sends, through a pipe.
+TEST(Content, NonsenseRecords) {
+    const auto bytes = [](const Record& record, const std::string& after = "") {
+        return std::string(reinterpret_cast<const char*>(&record), sizeof record) + after;
+    };
+    const auto entry = [&](const std::string& name, const std::string& target, Record record) {
+        record.kind = RecordKind::entry;
+        record.first = static_cast<std::uint32_t>(name.size());
+        record.second = static_cast<std::uint32_t>(target.size());
+        return bytes(record, name + target);
+    };
+    const std::string file = entry("f", "", {.flags = recordHasSize, .mode = S_IFREG | 0644, .offset = 4});
+    const std::vector<std::pair<std::string, const char*>> rows = {
+        {"", "too early"},
+        {"abc", "too early"},
+        {file, "too early"},
+        {bytes({.kind = RecordKind{0}}), "nonsense"},
+        {bytes({.kind = RecordKind{77}}), "nonsense"},
+        {bytes({.kind = RecordKind::entry, .first = 0xFFFF'FFFF}), "nonsense"},
+        {bytes({.kind = RecordKind::entry, .first = 200'000, .second = 200'000}), "nonsense"},
+        {bytes({.kind = RecordKind::data, .first = 1, .second = 1}), "nonsense"},
+        {bytes({.kind = RecordKind::data, .first = 1}, "x"), "data of no file"},
+        {entry("d", "", {.mode = S_IFDIR | 0755}) + bytes({.kind = RecordKind::data, .first = 1}, "x"),
+         "data of no file"},
+        {file + bytes({.kind = RecordKind::data, .first = 1, .offset = -1}, "x"), "out of order"},
+        {file + bytes({.kind = RecordKind::data, .first = 1, .offset = INT64_MAX}, "x"), "out of order"},
+        {file + bytes({.kind = RecordKind::data, .first = 5}, "12345") + bytes({.kind = RecordKind::end}),
+         "longer than it says"},
+        {file + bytes({.kind = RecordKind::data, .first = 1, .offset = 1}, "x") +
+             bytes({.kind = RecordKind::data, .first = 1}, "x"),
+         "out of order"},
+        {entry("f", "", {.flags = recordHasSize, .mode = S_IFREG | 0644, .offset = -5}) +
+             bytes({.kind = RecordKind::end}),
+         "longer than it says"},
+        {entry(std::string("f\0g", 3), "", {.mode = S_IFREG | 0644}), "NUL"},
+        {entry("l", std::string("f\0g", 3), {.mode = S_IFLNK | 0777}), "NUL"},
+        {entry("l", "", {.mode = S_IFLNK | 0777}), "without a target"},
+        {entry("x", "", {.mode = 0xFFFF'FFFF}), "refused"},
+        {entry("", "", {.mode = S_IFREG}), "no name"},
+        {bytes({.kind = RecordKind::failure, .first = 4}, "\x1b[2J"), "\\x1b"},
+    };
+    for (const auto& [sent, why] : rows) {
+        SCOPED_TRACE(why);
+        World world;
+        int ends[2];
+        ASSERT_EQ(::pipe2(ends, O_CLOEXEC), 0);
+        const FileDescriptor reading(ends[0]);
+        ASSERT_EQ(::write(ends[1], sent.data(), sent.size()), static_cast<ssize_t>(sent.size()));
+        ::close(ends[1]);
+        const FileDescriptor directory(::open(world.path("/source").c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+        zor::platform::LinuxDisk disk(zor::platform::Syncs::off);
+        Course course(directory.get(), noSignal, {});
+        const auto outcome = Unpacker(disk, directory.get(), {}, course).unpack(reading.get());
+        ASSERT_FALSE(outcome);
+        EXPECT_NE(outcome.error().what.find(why), std::string::npos) << outcome.error().what;
+        EXPECT_FALSE(world.isDamaged());
+    }
+}
+
+// Goal: a small archive cannot fill the disk, nor make items without end. Method: a file that unpacks to more than a
+// small file system may lose; a count beyond the limit.
+TEST(Content, Bombs) {
+    const FileDescriptor here(::open("/", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    Course course(here.get(), noSignal, {});
+    std::uint64_t items = 0;
+    for (; items <= itemsMax && course.addItem(); ++items) {
+    }
+    EXPECT_EQ(items, itemsMax);
+    if (::geteuid() != 0)
+        GTEST_SKIP() << "only root can make a small file system";
+    const zor::support::TemporaryDirectory directory;
+    if (::mount("none", directory.path().c_str(), "tmpfs", 0, "size=64m") != 0)
+        GTEST_SKIP() << "mounts are not permitted here";
+    {
+        World world(directory.path());
+        const std::string before = world.content();
+        const std::string bomb = makeArchive(Form::tarZstd, {file("zeros", std::string(80'000'000, '\0'))});
+        ASSERT_LT(bomb.size(), 100'000U);
+        expectRefused(world, before, world.putArchive(bomb), "too little space");
+    }
+    ::umount2(directory.path().c_str(), MNT_DETACH);
+}
+
+// Goal: no failure of the disk is taken for success, and what is said to have come in is durable whatever the power
+// does then. Method: each call that changes the disk fails, for an archive and a directory; then the power goes at the
+// end, under both models of a disk.
+TEST(Content, EveryCallFailsAndThePowerGoes) {
+    const std::string archive =
+        makeArchive(Form::tar, {directory("d"), file("d/f", std::string(300'000, 'f')), hardLink("again", "d/f"),
+                                symbolicLink("l", "d"), file("Documents/g"), file("empty", "")});
+    const auto prepare = [&](World& world, bool asArchive) {
+        writeFile(world.path("/archive"), archive);
+        ::mkdir(world.path("/source/Documents").c_str(), 0755);
+        writeFile(world.path("/source/Documents/f"), std::string(300'000, 'f'));
+        EXPECT_EQ(::symlink("Documents", world.path("/source/l").c_str()), 0);
+        EXPECT_EQ(::link(world.path("/source/Documents/f").c_str(), world.path("/source/again").c_str()), 0);
+        return asArchive ? "/archive" : "/source";
+    };
+    for (const bool asArchive : {true, false}) {
+        zor::platform::LinuxDisk real(zor::platform::Syncs::off);
+        struct Run {
+            std::unique_ptr<World> world;
+            zor::support::FaultDisk& disk;
+            std::string source;
+            bool done = false;
+        };
+        const auto report = zor::support::forEachFaultPoint(
+            real, {.error = ENOSPC, .span = zor::support::FaultSpan::once},
+            [&](zor::support::FaultDisk& disk) {
+                Run run{.world = std::make_unique<World>(), .disk = disk, .source = {}};
+                run.source = prepare(*run.world, asArchive);
+                return run;
+            },
+            [](Run& run) { run.done = run.world->put(run.source, run.disk).has_value(); },
+            [](const Run& run, const zor::support::FaultOutcome& outcome) -> std::string {
+                if (run.world->isDamaged())
+                    return "something outside changed";
+                return run.done == !outcome.met ? "" : "a failure passed for success";
+            });
+        EXPECT_EQ(report.complaint, "");
+        EXPECT_GT(report.examined, 20U);
+
+        World world;
+        const std::string source = prepare(world, asArchive);
+        zor::support::RecordingDisk recording(real, world.path("/container"));
+        recording.start();
+        ASSERT_TRUE(world.put(source, recording));
+        EXPECT_EQ(recording.complaint(), "");
+        const auto log = recording.log();
+        const std::string whole = zor::support::readTree(world.path("/container")).describe();
+        for (const auto model : {zor::support::DiskModel::orderedJournal, zor::support::DiskModel::unordered})
+            for (const auto& state : zor::support::PowerCut(log, {.model = model}).statesAfter(log.operations.size()))
+                EXPECT_EQ(state.tree.describe(), whole) << state.description;
+    }
+}
+
+/// As the container's owner: moves, links and replaces what is in the container until it is killed.
+[[noreturn]] void raceAsOwner(const std::string& container) {
+    if (::setgid(ownerId) != 0 || ::setuid(ownerId) != 0 || ::chdir(container.c_str()) != 0)
+        ::_exit(1);
+    for (unsigned round = 0;; ++round) {
+        std::vector<std::string> names = {"Documents", "f", "d", "d/g"};
+        std::error_code ignored;
+        for (const auto& entry : std::filesystem::directory_iterator(".", ignored))
+            names.push_back(entry.path().filename());
+        for (const std::string& name : names) {
+            (void)::rename(name.c_str(), ("moved" + std::to_string(round % 3)).c_str());
+            (void)!::symlink(round % 2 == 0 ? "../outside" : "../outside/file", name.c_str());
+            if (round % 5 == 0)
+                (void)::unlink(name.c_str());
+        }
+    }
+}
+
+// Goal: root writes nothing outside while the container's owner does what he likes with the container. Method: he
+// moves everything about and leaves links to outside in its place; afterwards outside is as it was.
+TEST(Content, OwnerWhoChangesTheContainerMeanwhile) {
+    if (::geteuid() != 0)
+        GTEST_SKIP() << "only root can have another owner";
+    std::vector<Made> entries;
+    for (int i = 0; i < 40; ++i) {
+        entries.push_back(file("f" + std::to_string(i)));
+        entries.push_back(file("d/" + std::to_string(i) + "/g"));
+    }
+    for (const char* name : {"Documents/x", "f", "d/g"})
+        entries.push_back(file(name));
+    const std::string archive = makeArchive(Form::tar, entries);
+    const auto seconds = std::chrono::seconds(std::getenv("ZORVANE_TEST_LONG") ? 30 : 2);
+    const auto end = std::chrono::steady_clock::now() + seconds;
+    int succeeded = 0;
+    int refused = 0;
+    while (std::chrono::steady_clock::now() < end) {
+        World world;
+        const pid_t owner = ::fork();
+        if (owner == 0)
+            raceAsOwner(world.path("/container"));
+        for (int i = 0; i < 20; ++i)
+            ++(world.putArchive(archive) ? succeeded : refused);
+        ::kill(owner, SIGKILL);
+        int status = 0;
+        ::waitpid(owner, &status, 0);
+        ASSERT_TRUE(WIFSIGNALED(status)) << "the owner did not race";
+        ASSERT_FALSE(world.isDamaged());
+    }
+    std::printf("%d came in, %d were refused\n", succeeded, refused);
+    EXPECT_GT(succeeded + refused, 20);
+}
+
+} // namespace
+} // namespace zorvanectl::content::test

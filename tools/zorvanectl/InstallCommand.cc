@@ -1,0 +1,268 @@
+// SPDX-License-Identifier: Apache-2.0
+// An archive or a directory becomes the content of a container: a transient container is made, filled, and put in the
+// place of the live one with one replace.
+//
+// Until that replace the live container is not touched, and the replace puts it away only when the new one takes its
+// place. So whatever fails (a signal, a full disk, a broken archive, a daemon that went away), the old one stays as it
+// was. The transient one is deleted then. Where that cannot be, after a kill of this program or with the daemon gone,
+// it lies there until it is asked for again, which the next installation does, until somebody deletes the identifier's
+// transient container (zorvanectl delete --transient), or until the first launch after a boot sweeps it.
+//
+// Nobody is deleted on a guess: when a replace fails or its answer is lost, the daemon is asked what is live now.
+#include "Commands.h"
+#include "KnownContainer.h"
+#include "ProgressDisplay.h"
+#include "content/Content.h"
+#include "platform/linux/LinuxDisk.h"
+#include "platform/linux/Openat2.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <csignal>
+#include <fcntl.h>
+#include <initializer_list>
+#include <sys/stat.h>
+#include <unistd.h>
+
+namespace zorvanectl {
+
+using zor::platform::FileDescriptor;
+using zorvane::Client;
+
+namespace {
+
+volatile std::sig_atomic_t receivedSignal = 0;
+
+void keepSignal(int signal) {
+    receivedSignal = signal;
+}
+
+/// Signals are kept for as long as this lives; the program decides when to end.
+class SignalKeeper {
+public:
+    SignalKeeper() {
+        struct sigaction keep{};
+        keep.sa_handler = keepSignal; // without SA_RESTART: a read that waits is to end
+        for (const int signal : {SIGINT, SIGTERM, SIGHUP}) {
+            struct sigaction before{};
+            // What was ignored when this program began, as under nohup, stays so.
+            if (::sigaction(signal, nullptr, &before) == 0 && before.sa_handler != SIG_IGN)
+                ::sigaction(signal, &keep, nullptr);
+        }
+        std::signal(SIGPIPE, SIG_IGN); // who reads the progress may go; the installation goes on
+    }
+    /// Ends as the signal would have ended it, once everything is in order.
+    static void endBySignal() {
+        if (const int signal = receivedSignal; signal != 0) {
+            std::signal(signal, SIG_DFL);
+            ::raise(signal);
+        }
+    }
+};
+
+bool canBeInstalled(std::uint64_t containerClass) {
+    const std::string_view name = zorvane::containerClassName(containerClass);
+    return name.starts_with("Bundle/") || (name.starts_with("Data/") && name != "Data/System");
+}
+
+class Installation {
+public:
+    Installation(const zorvane::ConnectOptions& connect, const Output& output, const Target& target,
+                 const InstallOptions& options)
+        : connect_(connect), output_(output), target_(target), options_(options),
+          what_("install " + options.source + " as " + target.identifier + " in " +
+                std::string(zorvane::containerClassName(target.containerClass))) {}
+
+    int run(Consent consent);
+
+private:
+    int install(Client& client);
+    int replace(Client& client);
+    int settle(const zorvane::Error& error);
+    int done(Client& client);
+    int failed(const std::string& message);
+    /// What became of the transient container, for the end of a message.
+    std::string discard();
+    [[nodiscard]] content::Outcome<FileDescriptor> openContainer() const;
+
+    const zorvane::ConnectOptions& connect_;
+    const Output& output_;
+    const Target& target_;
+    const InstallOptions& options_;
+    const std::string what_;
+    const SignalKeeper signals_;
+    content::Source source_;
+    std::optional<Client::Address> old_;
+    Client::Address fresh_;
+    std::string freshPath_;
+    std::uint64_t bytesOut_ = 0;
+    std::uint64_t bytesIn_ = 0;
+    std::uint64_t items_ = 0;
+};
+
+int Installation::run(Consent consent) {
+    if (!canBeInstalled(target_.containerClass))
+        return output_.localError(exitUsage, "only bundle and data containers get their content this way",
+                                  "name another class", what_);
+    auto source = content::Source::open(options_.source);
+    if (!source)
+        return output_.localError(exitUsage, source.error().what, "name an archive or a directory", what_);
+    source_ = std::move(*source);
+    auto client = Client::connect(connect_);
+    if (!client)
+        return output_.error(client.error(), what_);
+    const auto old = find(*client, target_, false);
+    if (!old && old.error().code != codeNotFound)
+        return output_.error(old.error(), what_);
+    if (old) {
+        old_ = *old;
+        bytesOut_ = client->diskUsage(*old_).value_or(0);
+        const std::string question = "Replace " + shownBytes(bytesOut_) + " of " + printable(target_.identifier) + "?";
+        if (consent == Consent::ask && !output_.agreed(question))
+            return exitUsage;
+    }
+    const int exitCode = install(*client);
+    if (exitCode != exitDone) // what is done is not told as interrupted
+        SignalKeeper::endBySignal();
+    return exitCode;
+}
+
+int Installation::install(Client& client) {
+    const auto made = client.createOrLookup({.containerClass = target_.containerClass,
+                                             .user = userOf(target_),
+                                             .identifier = target_.identifier,
+                                             .create = true,
+                                             .transient = true});
+    if (!made)
+        return output_.error(made.error(), what_);
+    freshPath_ = made->path;
+    fresh_ = {.containerClass = target_.containerClass,
+              .user = userOf(target_),
+              .identifier = target_.identifier,
+              .uuid = made->uuid};
+    const auto container = openContainer();
+    if (!container)
+        return failed(container.error().what);
+    {
+        ProgressDisplay display(options_.progress);
+        const content::Observer observer{.progressed =
+                                             [&](content::Phase phase, const content::Progress& progress) {
+                                                 display.show(
+                                                     {.phase = phase == content::Phase::copying ? "copying" : "syncing",
+                                                      .items = progress.items,
+                                                      .bytes = progress.bytes,
+                                                      .share = progress.share});
+                                             },
+                                         .wantsShare = display.isShown()};
+        zor::platform::LinuxDisk disk;
+        const auto filled = content::putContent(disk, container->get(), source_, observer, receivedSignal);
+        if (!filled)
+            return failed(filled.error().what);
+        items_ = filled->items;
+    }
+    // The daemon may have been started anew meanwhile.
+    auto again = Client::connect(connect_);
+    if (!again)
+        return failed(again.error().message);
+    return replace(*again);
+}
+
+content::Outcome<FileDescriptor> Installation::openContainer() const {
+    const FileDescriptor root(::open("/", O_PATH | O_DIRECTORY | O_CLOEXEC));
+    const char* const path = freshPath_.c_str();
+    auto container =
+        zor::platform::openBeneath(root.get(), path[0] == '/' ? path + 1 : path, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
+    if (!container)
+        return content::failed("the new container cannot be opened", container.error());
+    // Its owner may have put another directory in its place; one of root's must not get content that root writes.
+    struct stat status{};
+    if (::fstat(container->get(), &status) != 0 || (::geteuid() == 0 && (status.st_uid == 0) != (fresh_.user == 0)))
+        return content::failed("somebody put something else in the place of the new container");
+    return std::move(*container);
+}
+
+int Installation::replace(Client& client) {
+    // Standard subdirectories that the content took the place of get their owner and mode again, or come back.
+    if (const auto repaired = client.recreateDefaultStructure(fresh_); !repaired)
+        return failed(repaired.error().message);
+    bytesIn_ = client.diskUsage(fresh_).value_or(0);
+    if (receivedSignal != 0)
+        return failed("it was interrupted");
+    if (const auto replaced = client.replace(old_, fresh_); !replaced)
+        return settle(replaced.error());
+    return done(client);
+}
+
+/// The replace failed, or its answer did not come.
+int Installation::settle(const zorvane::Error& error) {
+    auto client = Client::connect(connect_);
+    const auto live = client ? client->list(target_.containerClass, userOf(target_), false)
+                             : zorvane::Result<std::vector<zorvane::ListedContainer>>(std::unexpected(client.error()));
+    if (!live)
+        return failed(error.message + ". The old container or the new one is there, whole; 'zorvanectl list' tells");
+    const auto isLive = [&](const std::array<std::uint8_t, 16>& uuid) {
+        return std::ranges::find(*live, uuid, &zorvane::ListedContainer::uuid) != live->end();
+    };
+    if (isLive(fresh_.uuid))
+        return done(*client);
+    if (!old_ || isLive(old_->uuid))
+        return failed(error.message);
+    return output_.localError(exitLocalError,
+                              error.message +
+                                  ". The old container is not there any more; the new content waits, whole, in " +
+                                  printable(freshPath_),
+                              "'zorvanectl replace' puts it in place until the next boot", what_);
+}
+
+int Installation::done(Client& client) {
+    const auto metadata = client.metadata(fresh_);
+    const std::string path = metadata ? metadata->path : "";
+    if (output_.isJson()) {
+        nlohmann::json json = {{"identifier", target_.identifier},
+                               {"class", target_.containerClass},
+                               {"uuid", zorvane::uuidText(fresh_.uuid)},
+                               {"path", path},
+                               {"items", items_},
+                               {"bytesIn", bytesIn_},
+                               {"replaced", old_.has_value()}};
+        json["bytesOut"] = bytesOut_;
+        output_.json(json);
+        return exitDone;
+    }
+    output_.line(printable(target_.identifier) + " installed: " + shownBytes(bytesIn_) + " in " +
+                 std::to_string(items_) + (items_ == 1 ? " item" : " items") + " came" +
+                 (old_ ? ", " + shownBytes(bytesOut_) + " went" : ""));
+    output_.line("  path  " + printable(path));
+    return exitDone;
+}
+
+int Installation::failed(const std::string& message) {
+    return output_.localError(exitLocalError, message + ". " + discard(),
+                              old_ ? "the old container is as it was; try again when the cause is gone"
+                                   : "try again when the cause is gone",
+                              what_);
+}
+
+std::string Installation::discard() {
+    const std::string left = "The new container stays in " + printable(freshPath_) + " until the next boot";
+    auto client = Client::connect(connect_);
+    if (!client)
+        return left;
+    const auto transient = find(*client, target_, true);
+    if (!transient)
+        return transient.error().code == codeNotFound ? "The new container is gone" : left;
+    if (transient->uuid != fresh_.uuid)
+        return "The new container made room for somebody else's";
+    // By its being transient: it can never take one with it that has become live.
+    const auto deleted = client->deleteContainer(target_.containerClass, userOf(target_), target_.identifier, true);
+    return deleted || deleted.error().code == codeNotFound ? "The new container was thrown away" : left;
+}
+
+} // namespace
+
+int install(const zorvane::ConnectOptions& connect, const Output& output, const Target& target,
+            const InstallOptions& options, Consent consent) {
+    return Installation(connect, output, target, options).run(consent);
+}
+
+} // namespace zorvanectl

@@ -1,0 +1,154 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "Content.h"
+
+#include "Decoder.h"
+#include "ItemRules.h"
+#include "SealedDirectory.h"
+#include "Unpacker.h"
+#include "fs/DiskUsage.h"
+#include "fs/RecursiveCopy.h"
+#include "zorvane/Text.h"
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <fcntl.h>
+#include <optional>
+#include <sys/stat.h>
+#include <unistd.h>
+
+namespace zorvanectl::content {
+
+using zor::platform::FileDescriptor;
+
+namespace {
+
+/// A tar ends with empty blocks. One that was cut between two entries lacks them, and its reader would not notice.
+constexpr std::size_t tarBlockBytes = 512;
+
+Outcome<void> checkTarEnd(int archive, std::uint64_t bytes) {
+    std::array<char, tarBlockBytes> block{};
+    if (bytes < block.size() || ::pread(archive, block.data(), block.size(),
+                                        static_cast<off_t>(bytes - block.size())) != static_cast<ssize_t>(block.size()))
+        return failed("the archive's end cannot be read");
+    if (std::ranges::any_of(block, [](char byte) { return byte != 0; }))
+        return failed("the archive has no end: it was cut");
+    return {};
+}
+
+Outcome<void> unpack(zor::platform::Disk& disk, const SealedDirectory& sealed, const Source& source, Owner owner,
+                     Course& course) {
+    course.expectBytes(source.bytes());
+    const auto decoder = Decoder::start(source.get());
+    if (!decoder)
+        return std::unexpected(decoder.error());
+    const auto end = Unpacker(disk, sealed.get(), owner, course).unpack(decoder->records());
+    if (!end)
+        return std::unexpected(end.error());
+    return (*end & recordUncompressedTar) != 0 ? checkTarEnd(source.get(), source.bytes()) : Outcome<void>();
+}
+
+/// Copies a directory, and keeps why an item was refused.
+class DirectoryCopy {
+public:
+    DirectoryCopy(const struct stat& container, Course& course) : container_(container), course_(course) {}
+
+    [[nodiscard]] Outcome<void> copy(zor::platform::Disk& disk, const Source& source, const SealedDirectory& sealed) {
+        const zor::fs::ContentRules rules{
+            .owner = container_.st_uid,
+            .group = container_.st_gid,
+            .admit = [this](const zor::fs::WalkEntry& entry, const char* target) { return admit(entry, target); },
+            .copied = [this](std::uint64_t bytes) { return answer(course_.addBytes(bytes)); },
+            .failed = [this](const zor::fs::WalkEntry& entry, int error) { fail(entry, error); }};
+        const int result = zor::fs::copyContent(disk, source.get(), sealed.get(), rules);
+        if (result == 0)
+            return {};
+        return failure_ ? std::unexpected(*failure_) : failed("the source cannot be copied", -result);
+    }
+
+private:
+    int admit(const zor::fs::WalkEntry& entry, const char* target) {
+        if (entry.status.st_dev == container_.st_dev && entry.status.st_ino == container_.st_ino)
+            return answer(failed("the source holds the container itself"));
+        const std::string name = entry.path();
+        const Item item{.name = name, .mode = entry.status.st_mode, .linkTarget = target ? target : ""};
+        if (const auto why = whyRefused(item))
+            return answer(failed(refusal(name, *why)));
+        return answer(course_.addItem());
+    }
+
+    int answer(const Outcome<void>& outcome) {
+        if (outcome)
+            return 0;
+        failure_ = outcome.error();
+        return -ECANCELED;
+    }
+
+    void fail(const zor::fs::WalkEntry& entry, int error) {
+        if (failure_)
+            return;
+        const std::string name = entry.depth == 0 ? "the source" : zorvane::printable(entry.path());
+        if (entry.onOtherFileSystem)
+            failure_ = Failure{.what = name + " lies on another file system than the source"};
+        else
+            failure_ = failed(name + " cannot be copied", -error).error();
+    }
+
+    const struct stat& container_;
+    Course& course_;
+    std::optional<Failure> failure_;
+};
+
+} // namespace
+
+Outcome<Source> Source::open(const std::string& path) {
+    Source source;
+    // What is no regular file must not hold the opening.
+    source.file_.reset(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+    struct stat status{};
+    if (!source.file_.valid() || ::fstat(source.file_.get(), &status) != 0)
+        return failed(zorvane::printable(path) + " cannot be opened", errno);
+    if (!S_ISDIR(status.st_mode) && !S_ISREG(status.st_mode))
+        return failed(zorvane::printable(path) + " is neither a directory nor a file");
+    source.isDirectory_ = S_ISDIR(status.st_mode);
+    source.bytes_ = static_cast<std::uint64_t>(status.st_size);
+    return source;
+}
+
+Outcome<Progress> putContent(zor::platform::Disk& disk, int container, const Source& source, const Observer& observer,
+                             const volatile std::sig_atomic_t& stop) {
+    struct stat status{};
+    if (::fstat(container, &status) != 0)
+        return failed("the container cannot be examined", errno);
+    const auto report = [&](Phase phase, const Progress& progress) {
+        if (observer.progressed)
+            observer.progressed(phase, progress);
+    };
+    Course course(container, stop, [&](const Progress& progress) { report(Phase::copying, progress); });
+    if (auto room = course.checkRoom(); !room)
+        return std::unexpected(room.error());
+    auto sealed = SealedDirectory::make(disk, container);
+    if (!sealed)
+        return std::unexpected(sealed.error());
+    Outcome<void> done;
+    if (source.isDirectory()) {
+        if (observer.wantsShare)
+            course.expectBytes(zor::fs::diskUsage(source.get(), {}, {}));
+        done = DirectoryCopy(status, course).copy(disk, source, *sealed);
+    } else {
+        done = unpack(disk, *sealed, source, {.user = status.st_uid, .group = status.st_gid}, course);
+    }
+    if (done)
+        done = sealed->raise();
+    report(Phase::syncing, course.progress());
+    if (done)
+        if (const int synced = disk.syncFileSystem(container); synced < 0)
+            done = failed("the content cannot be brought to the disk", -synced);
+    if (done)
+        done = course.checkStopped();
+    if (!done)
+        return std::unexpected(done.error());
+    return course.progress();
+}
+
+} // namespace zorvanectl::content

@@ -1,0 +1,52 @@
+// SPDX-License-Identifier: Apache-2.0
+// Puts an archive, or what is in a directory, into a new container.
+//
+// All of it is put together in a hidden directory that nobody else can reach (SealedDirectory.h), moved up when it is
+// whole, and synced. What the container has besides, its standard subdirectories, stays unless the content has the same
+// name. A failure, or a stop at any point, leaves a container that is good for nothing but being thrown away.
+//
+// The source may belong to somebody hostile and change meanwhile; the container's owner may change the container. One
+// thread.
+#pragma once
+
+#include "Course.h"
+#include "Failure.h"
+#include "platform/Disk.h"
+#include "platform/FileDescriptor.h"
+
+#include <csignal>
+#include <functional>
+#include <string>
+
+namespace zorvanectl::content {
+
+/// An open archive or directory.
+class Source {
+public:
+    /// A path of the caller's own, followed wherever it leads.
+    [[nodiscard]] static Outcome<Source> open(const std::string& path);
+
+    [[nodiscard]] bool isDirectory() const { return isDirectory_; }
+    [[nodiscard]] int get() const { return file_.get(); }
+    [[nodiscard]] std::uint64_t bytes() const { return bytes_; }
+
+private:
+    zor::platform::FileDescriptor file_;
+    bool isDirectory_ = false;
+    std::uint64_t bytes_ = 0; // of the archive's file
+};
+
+enum class Phase { copying, syncing };
+
+struct Observer {
+    /// Called often while copying.
+    std::function<void(Phase, const Progress&)> progressed;
+    /// The share is wanted, which costs a look at everything in a directory.
+    bool wantsShare = false;
+};
+
+/// `container` is open for reading. What came in; the content is on the disk then.
+[[nodiscard]] Outcome<Progress> putContent(zor::platform::Disk& disk, int container, const Source& source,
+                                           const Observer& observer, const volatile std::sig_atomic_t& stop);
+
+} // namespace zorvanectl::content

@@ -1,0 +1,36 @@
+// SPDX-License-Identifier: Apache-2.0
+// A process that decodes an archive and sends records (ArchiveRecord.h), for a reader that may be root.
+//
+// Archives are hostile and their decoders large. So the decoding is done where a mistake in it is worth nothing: as
+// root, the process becomes nobody; it holds the archive and the pipe, and can open, write and start nothing else. Run
+// by another user it keeps that user's right to remove and rename. It ends with its parent, and with this object.
+//
+// Read are tar of all dialects, zip, cpio and 7-Zip, compressed by what the library undoes itself. Forms for which it
+// would run other programs, or read other files that the archive names, are left out.
+#pragma once
+
+#include "Failure.h"
+#include "platform/FileDescriptor.h"
+
+#include <sys/types.h>
+
+namespace zorvanectl::content {
+
+class Decoder {
+public:
+    /// `archive` is a regular file, open for reading at its beginning. In a process with one thread.
+    [[nodiscard]] static Outcome<Decoder> start(int archive);
+    Decoder(Decoder&& other) noexcept;
+    Decoder& operator=(Decoder&&) = delete;
+    ~Decoder();
+
+    [[nodiscard]] int records() const { return records_.get(); }
+
+private:
+    Decoder(pid_t pid, zor::platform::FileDescriptor records) : pid_(pid), records_(std::move(records)) {}
+
+    pid_t pid_;
+    zor::platform::FileDescriptor records_;
+};
+
+} // namespace zorvanectl::content

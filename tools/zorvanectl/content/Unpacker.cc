@@ -1,0 +1,301 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "Unpacker.h"
+
+#include "ItemRules.h"
+#include "platform/linux/Openat2.h"
+#include "zorvane/Text.h"
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <cstring>
+#include <ctime>
+#include <fcntl.h>
+#include <limits>
+#include <sys/stat.h>
+#include <unistd.h>
+
+namespace zorvanectl::content {
+
+using zor::platform::FileDescriptor;
+using zor::platform::openBeneathOnMount;
+
+namespace {
+
+constexpr mode_t accessBits = 0777;
+constexpr mode_t impliedDirectoryMode = 0755;
+
+std::string_view textOf(std::span<const std::uint8_t> bytes) {
+    return {reinterpret_cast<const char*>(bytes.data()), bytes.size()};
+}
+
+std::unexpected<Failure> refused(std::string_view name, std::string_view reason) {
+    return failed(refusal(name, reason));
+}
+
+} // namespace
+
+Outcome<std::uint32_t> Unpacker::unpack(int records) {
+    for (;;) {
+        const auto head = take(records, sizeof(Record));
+        if (!head)
+            return std::unexpected(head.error());
+        Record record;
+        std::memcpy(&record, head->data(), sizeof record);
+        const bool named = record.kind == RecordKind::entry;
+        if (record.first > recordBytesMax || record.second > (named ? recordBytesMax - record.first : 0))
+            return failed("the archive's decoder sends nonsense");
+        const auto bytes = take(records, std::size_t{record.first} + record.second);
+        if (!bytes)
+            return std::unexpected(bytes.error());
+        course_.readTo(record.readBytes);
+        Outcome<void> done;
+        switch (record.kind) {
+        case RecordKind::entry:
+            done = finishFile();
+            if (done)
+                done = beginEntry(record, textOf(bytes->first(record.first)), textOf(bytes->subspan(record.first)));
+            break;
+        case RecordKind::data:
+            done = writeData(record, *bytes);
+            break;
+        case RecordKind::end:
+            done = finishFile();
+            if (done)
+                return record.flags;
+            break;
+        case RecordKind::failure:
+            return failed("the archive cannot be read: " + zorvane::printable(std::string(textOf(*bytes))));
+        default:
+            return failed("the archive's decoder sends nonsense");
+        }
+        if (!done)
+            return std::unexpected(done.error());
+    }
+}
+
+/// At least so many bytes lie in the buffer then.
+Outcome<void> Unpacker::fill(int records, std::size_t bytes) {
+    if (buffer_.size() - begin_ < bytes) {
+        std::memmove(buffer_.data(), buffer_.data() + begin_, end_ - begin_);
+        end_ -= begin_;
+        begin_ = 0;
+    }
+    while (end_ - begin_ < bytes) {
+        const ssize_t count = ::read(records, buffer_.data() + end_, buffer_.size() - end_);
+        if (auto stopped = course_.checkStopped(); !stopped)
+            return stopped;
+        if (count < 0 && errno == EINTR)
+            continue;
+        if (count < 0)
+            return failed("the archive's decoder cannot be read", errno);
+        if (count == 0)
+            return failed("the archive's decoder ended too early: the archive asks for too much, or breaks it");
+        end_ += static_cast<std::size_t>(count);
+    }
+    return {};
+}
+
+/// Good until the next call.
+Outcome<std::span<const std::uint8_t>> Unpacker::take(int records, std::size_t bytes) {
+    if (auto filled = fill(records, bytes); !filled)
+        return std::unexpected(filled.error());
+    const std::span<const std::uint8_t> taken = std::span(buffer_).subspan(begin_, bytes);
+    begin_ += bytes;
+    return taken;
+}
+
+Outcome<void> Unpacker::beginEntry(const Record& record, std::string_view name, std::string_view target) {
+    auto plain = plainName(name);
+    if (!plain)
+        return refused(name, plain.error());
+    entry_ = {.record = record, .name = std::move(*plain), .target = std::string(target)};
+    if (target.find('\0') != target.npos)
+        return refused(name, "its target holds a NUL");
+    const bool hardLink = (record.flags & recordHardLink) != 0;
+    if (entry_.name.empty()) {
+        // The top is the container itself.
+        if (hardLink || !S_ISDIR(record.mode))
+            return refused(name, "the container itself can only be a directory");
+        return {};
+    }
+    const mode_t mode = hardLink ? S_IFREG : static_cast<mode_t>(record.mode);
+    if (const auto why = whyRefused({.name = entry_.name, .mode = mode, .linkTarget = target}))
+        return refused(entry_.name, *why);
+    auto place = placeOf(entry_.name);
+    if (!place)
+        return std::unexpected(place.error());
+    Outcome<void> made;
+    if (hardLink)
+        made = makeHardLink(*place);
+    else if (S_ISDIR(mode))
+        made = makeDirectory(place->directory, place->name, (mode & accessBits) | S_IRWXU);
+    else if (S_ISLNK(mode))
+        made = makeSymbolicLink(*place);
+    else
+        made = makeFile(*place);
+    return made ? course_.addItem() : made;
+}
+
+Outcome<Unpacker::Place> Unpacker::placeOf(const std::string& name) {
+    const std::size_t slash = name.rfind('/');
+    const std::string parent = slash == name.npos ? "." : name.substr(0, slash);
+    const std::string last = slash == name.npos ? name : name.substr(slash + 1);
+    if (!parent_.valid() || parent != parentPath_) {
+        constexpr int flags = O_PATH | O_DIRECTORY | O_NOFOLLOW;
+        auto opened = openBeneathOnMount(directory_, parent.c_str(), flags);
+        if (!opened && opened.error() == ENOENT) {
+            if (auto made = makeParents(parent); !made)
+                return std::unexpected(made.error());
+            opened = openBeneathOnMount(directory_, parent.c_str(), flags);
+        }
+        if (!opened)
+            return cannotMake(opened.error());
+        parent_ = std::move(*opened);
+        parentPath_ = parent;
+    }
+    return Place{.directory = parent_.get(), .name = last};
+}
+
+Outcome<void> Unpacker::makeParents(const std::string& path) {
+    FileDescriptor current;
+    for (std::size_t begin = 0; begin < path.size();) {
+        const std::size_t end = std::min(path.find('/', begin), path.size());
+        const std::string name = path.substr(begin, end - begin);
+        begin = end + 1;
+        const int parent = current.valid() ? current.get() : directory_;
+        auto below = openBeneathOnMount(parent, name.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
+        if (!below && below.error() == ENOENT) {
+            if (auto made = makeDirectory(parent, name, impliedDirectoryMode); !made)
+                return made;
+            if (auto counted = course_.addItem(); !counted)
+                return counted;
+            below = openBeneathOnMount(parent, name.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
+        }
+        if (!below)
+            return cannotMake(below.error());
+        current = std::move(*below);
+    }
+    return {};
+}
+
+Outcome<void> Unpacker::makeDirectory(int parent, const std::string& name, mode_t mode) {
+    const int made = disk_.makeDirectory(parent, name.c_str(), 0700);
+    if (made < 0 && made != -EEXIST)
+        return cannotMake(-made);
+    const auto directory = openBeneathOnMount(parent, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
+    if (!directory)
+        return cannotMake(directory.error() == ENOTDIR || directory.error() == ELOOP ? EEXIST : directory.error());
+    if (const int owned = disk_.changeOwner(directory->get(), owner_.user, owner_.group); owned < 0)
+        return cannotMake(-owned);
+    if (const int moded = disk_.changeMode(directory->get(), mode); moded < 0)
+        return cannotMake(-moded);
+    return {};
+}
+
+Outcome<void> Unpacker::makeFile(const Place& place) {
+    FileDescriptor file(disk_.createFile(place.directory, place.name.c_str(), 0600));
+    if (!file.valid())
+        return cannotMake(-file.get());
+    file_ = std::move(file);
+    fileEnd_ = 0;
+    return {};
+}
+
+Outcome<void> Unpacker::writeData(const Record& record, std::span<const std::uint8_t> bytes) {
+    if (bytes.empty())
+        return {};
+    if (!file_.valid())
+        return failed("the archive's decoder sends data of no file");
+    if (record.offset < fileEnd_ || record.offset > std::numeric_limits<std::int64_t>::max() - record.first)
+        return refused(entry_.name, "its data is out of order");
+    if (record.offset > fileEnd_ && ::lseek(file_.get(), record.offset, SEEK_SET) < 0)
+        return cannotMake(errno);
+    if (const int written = disk_.write(file_.get(), bytes); written < 0)
+        return cannotMake(-written);
+    fileEnd_ = record.offset + static_cast<std::int64_t>(bytes.size());
+    return course_.addBytes(bytes.size());
+}
+
+Outcome<void> Unpacker::finishFile() {
+    if (!file_.valid())
+        return {};
+    const FileDescriptor file = std::move(file_);
+    const Record& record = entry_.record;
+    const bool hasSize = (record.flags & recordHasSize) != 0;
+    if (hasSize && (record.offset < 0 || record.offset < fileEnd_))
+        return refused(entry_.name, "it is longer than it says");
+    if (hasSize && record.offset > fileEnd_) {
+        // It ends with a hole; its last byte gives it its length.
+        constexpr std::array<std::uint8_t, 1> zero{};
+        if (::lseek(file.get(), record.offset - 1, SEEK_SET) < 0)
+            return cannotMake(errno);
+        if (const int written = disk_.write(file.get(), zero); written < 0)
+            return cannotMake(-written);
+    }
+    if (const int owned = disk_.changeOwner(file.get(), owner_.user, owner_.group); owned < 0)
+        return cannotMake(-owned);
+    if (const int moded = disk_.changeMode(file.get(), static_cast<mode_t>(record.mode) & accessBits); moded < 0)
+        return cannotMake(-moded);
+    if ((record.flags & recordHasTime) == 0)
+        return {};
+    const timespec time{.tv_sec = record.timeSeconds,
+                        .tv_nsec = static_cast<long>(std::min<std::uint32_t>(record.timeNanoseconds, 999'999'999))};
+    if (const int timed = disk_.setTimes(file.get(), time, time); timed < 0)
+        return cannotMake(-timed);
+    return {};
+}
+
+Outcome<void> Unpacker::makeSymbolicLink(const Place& place) {
+    const int made = disk_.makeSymbolicLink(entry_.target.c_str(), place.directory, place.name.c_str());
+    if (made < 0)
+        return cannotMake(-made);
+    const FileDescriptor link(::openat(place.directory, place.name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+    if (!link.valid())
+        return cannotMake(errno);
+    const int owned = disk_.changeOwner(link.get(), owner_.user, owner_.group);
+    return owned < 0 ? cannotMake(-owned) : Outcome<void>();
+}
+
+Outcome<void> Unpacker::makeHardLink(const Place& place) {
+    const auto target = plainName(entry_.target);
+    if (!target)
+        return refused(entry_.name, "a hard link that leads out of the archive: " + target.error());
+    const std::size_t slash = target->rfind('/');
+    const std::string parent = slash == target->npos ? "." : target->substr(0, slash);
+    const std::string name = slash == target->npos ? *target : target->substr(slash + 1);
+    struct stat status{};
+    const auto directory = openBeneathOnMount(directory_, parent.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
+    if (!directory || ::fstatat(directory->get(), name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0 ||
+        !S_ISREG(status.st_mode))
+        return refused(entry_.name, "a hard link to what is no file earlier in the archive");
+    const int linked = disk_.makeHardLink(directory->get(), name.c_str(), place.directory, place.name.c_str());
+    if (linked < 0)
+        return cannotMake(-linked);
+    const bool hasData = (entry_.record.flags & recordHasSize) != 0 && entry_.record.offset > 0;
+    if (!hasData)
+        return {};
+    // Some forms keep the data of a file with the last of its names.
+    if (status.st_size != 0)
+        return refused(entry_.name, "the data of its file comes twice");
+    auto file = openBeneathOnMount(place.directory, place.name.c_str(), O_WRONLY | O_NOFOLLOW);
+    if (!file)
+        return cannotMake(file.error());
+    file_ = std::move(*file);
+    fileEnd_ = 0;
+    return {};
+}
+
+std::unexpected<Failure> Unpacker::cannotMake(int number) const {
+    switch (number) {
+    case EEXIST:
+        return refused(entry_.name, "it comes twice");
+    case ENOTDIR:
+    case ELOOP:
+        return refused(entry_.name, "it lies below something that is no directory");
+    default:
+        return failed(zorvane::printable(entry_.name) + " cannot be written", number);
+    }
+}
+
+} // namespace zorvanectl::content
