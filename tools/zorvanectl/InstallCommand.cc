@@ -244,7 +244,7 @@ int Installation::failed(const std::string& message) {
 }
 
 std::string Installation::discard() {
-    const std::string left = "The new container stays in " + printable(freshPath_) + " until the next boot";
+    std::string left = "The new container stays in " + printable(freshPath_) + " until the next boot";
     auto client = Client::connect(connect_);
     if (!client)
         return left;
