@@ -203,4 +203,8 @@ std::vector<Scenario> deletionScenarios() {
     return {deletion(), deletionOfMany(), deletionOfABundle(), release(), firstUseOfGroups()};
 }
 
+std::vector<Scenario> deletionScenariosAtHome() {
+    return {deletion(), deletionOfABundle(), release(), firstUseOfGroups()};
+}
+
 } // namespace zor::support

@@ -43,6 +43,7 @@ std::vector<Scenario> changeScenarios();
 std::vector<Scenario> changeScenariosAtHome();
 /// Deletion, the loss of last references, and the first use of groups. They work in the user's home too.
 std::vector<Scenario> deletionScenarios();
+std::vector<Scenario> deletionScenariosAtHome();
 /// As test names are spelled.
 std::string scenarioName(const ::testing::TestParamInfo<Scenario>& parameter);
 

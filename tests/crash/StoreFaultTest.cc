@@ -127,7 +127,7 @@ TEST_P(StoreFaultTest, StandsEveryStopOnDisk) {
 
 INSTANTIATE_TEST_SUITE_P(ChangeAtHome, HomeFaultTest, ::testing::ValuesIn(changeScenariosAtHome()), scenarioName);
 INSTANTIATE_TEST_SUITE_P(Change, StoreFaultTest, ::testing::ValuesIn(changeScenarios()), scenarioName);
-INSTANTIATE_TEST_SUITE_P(DeletionAtHome, HomeFaultTest, ::testing::ValuesIn(deletionScenarios()), scenarioName);
+INSTANTIATE_TEST_SUITE_P(DeletionAtHome, HomeFaultTest, ::testing::ValuesIn(deletionScenariosAtHome()), scenarioName);
 INSTANTIATE_TEST_SUITE_P(Deletion, StoreFaultTest, ::testing::ValuesIn(deletionScenarios()), scenarioName);
 INSTANTIATE_TEST_SUITE_P(Home, HomeFaultTest, ::testing::ValuesIn(homeScenarios()), scenarioName);
 INSTANTIATE_TEST_SUITE_P(Store, StoreFaultTest, ::testing::ValuesIn(storeScenarios()), scenarioName);

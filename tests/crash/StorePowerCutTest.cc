@@ -76,7 +76,8 @@ TEST_P(HomePowerCutTest, StandsEveryCutBetweenFileSystems) {
 
 INSTANTIATE_TEST_SUITE_P(ChangeAtHome, HomePowerCutTest, ::testing::ValuesIn(changeScenariosAtHome()), scenarioName);
 INSTANTIATE_TEST_SUITE_P(Change, StorePowerCutTest, ::testing::ValuesIn(changeScenarios()), scenarioName);
-INSTANTIATE_TEST_SUITE_P(DeletionAtHome, HomePowerCutTest, ::testing::ValuesIn(deletionScenarios()), scenarioName);
+INSTANTIATE_TEST_SUITE_P(DeletionAtHome, HomePowerCutTest, ::testing::ValuesIn(deletionScenariosAtHome()),
+                         scenarioName);
 INSTANTIATE_TEST_SUITE_P(Deletion, StorePowerCutTest, ::testing::ValuesIn(deletionScenarios()), scenarioName);
 INSTANTIATE_TEST_SUITE_P(Home, HomePowerCutTest, ::testing::ValuesIn(homeScenarios()), scenarioName);
 INSTANTIATE_TEST_SUITE_P(Store, StorePowerCutTest, ::testing::ValuesIn(storeScenarios()), scenarioName);
