@@ -3,6 +3,7 @@
 #include "fs/FileManagerWorld.h"
 #include "fs/MetadataFileName.h"
 
+#include <algorithm>
 #include <linux/fs.h>
 #include <sched.h>
 #include <sys/ioctl.h>

@@ -6,6 +6,7 @@
 #include "platform/linux/PassedSockets.h"
 #include "platform/linux/SeqpacketUpcallPort.h"
 
+#include <algorithm>
 #include <atomic>
 
 namespace zor::platform {

@@ -4,6 +4,7 @@
 #include "entitlements/ZOREntitlementMapping.h"
 #include "world/World.h"
 
+#include <algorithm>
 #include <future>
 #include <gtest/gtest.h>
 #include <sys/stat.h>

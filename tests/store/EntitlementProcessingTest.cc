@@ -5,6 +5,7 @@
 #include "entitlements/ZORGroupManager.h"
 #include "world/World.h"
 
+#include <algorithm>
 #include <atomic>
 #include <gtest/gtest.h>
 #include <set>

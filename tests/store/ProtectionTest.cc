@@ -5,6 +5,7 @@
 #include "protection/ZORDataProtectionManager.h"
 #include "store/DispatchFixture.h"
 
+#include <algorithm>
 #include <atomic>
 #include <fcntl.h>
 #include <gtest/gtest.h>

@@ -5,6 +5,7 @@
 #include "store/FewDescriptors.h"
 #include "world/World.h"
 
+#include <algorithm>
 #include <gtest/gtest.h>
 #include <stdexcept>
 #include <unistd.h>
