@@ -174,7 +174,7 @@ TEST(Content, HostileArchives) {
 // cut after every block and at odd places.
 TEST(Content, BrokenArchives) {
     std::string noise;
-    for (int i = 0; i < 20'000; ++i)
+    for (unsigned i = 0; i < 20'000; ++i)
         noise += static_cast<char>((i * i * 7919) >> 5);
     const std::vector<Made> entries = {directory("a"), file("a/f", std::string(3000, 'f')), file("g", noise)};
     struct Row {

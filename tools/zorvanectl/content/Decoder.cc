@@ -42,6 +42,11 @@ constexpr rlim_t memoryBytesMax = rlim_t{1} << 30;
 #define ZORVANECTL_SANITIZED
 #endif
 #endif
+#ifdef ZORVANECTL_SANITIZED
+constexpr bool limitsMemory = false; // a sanitizer has taken more address space already
+#else
+constexpr bool limitsMemory = true;
+#endif
 
 /// Cannot be taken back. The process has one thread and no more descriptors than it needs.
 bool becomePowerless(pid_t parent) {
@@ -55,10 +60,8 @@ bool becomePowerless(pid_t parent) {
         const rlimit both{.rlim_cur = value, .rlim_max = value};
         return ::setrlimit(resource, &both) == 0;
     };
-#ifndef ZORVANECTL_SANITIZED // a sanitizer has taken more address space already
-    if (!limit(RLIMIT_AS, memoryBytesMax))
+    if (limitsMemory && !limit(RLIMIT_AS, memoryBytesMax))
         return false;
-#endif
     // What is open stays so; nothing can be opened any more, not even in the place of what is closed.
     return limit(RLIMIT_NOFILE, 0) && limit(RLIMIT_FSIZE, 0) && limit(RLIMIT_NPROC, 0) && limit(RLIMIT_CORE, 0);
 }
