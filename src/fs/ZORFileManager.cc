@@ -145,6 +145,14 @@ bool ZORFileManager::itemDoesNotExistAtURL(const FileURL& url) {
     return failure == ENOENT;
 }
 
+bool ZORFileManager::itemDoesNotExistBelow(int directory, const char* relativePath, const FileURL& url) {
+    const auto item = openBeneath(directory, relativePath, O_PATH | O_NOFOLLOW);
+    if (!item && item.error() != ENOENT)
+        log_.write(logLevelError, __func__, "Failed to determine if %s exists: %s", url.c_str(),
+                   errorText(item.error()));
+    return !item && item.error() == ENOENT;
+}
+
 Result<int> ZORFileManager::dataProtectionClassOfItemAtURL(const FileURL& url) {
     const auto item = resolver_.openItem(url, O_RDONLY | O_NONBLOCK | O_NOCTTY);
     if (!item)
@@ -164,22 +172,25 @@ Result<void> ZORFileManager::setDataProtectionClassOfItemAtURL(const FileURL& ur
     return setClassOf(item->get(), url.path(), protectionClass, predicate);
 }
 
-Result<void> ZORFileManager::setDataProtectionClassOfEntry(const fs::WalkEntry& entry, const std::string& path,
-                                                           int protectionClass,
-                                                           const std::function<bool(int)>& predicate) {
+Result<void> ZORFileManager::setDataProtectionClassOfEntry(
+    const fs::WalkEntry& entry, const std::string& path, int protectionClass,
+    const std::function<bool(const struct stat& status, int current)>& predicate) {
     if (entry.directory >= 0)
-        return setClassOf(entry.directory, path, protectionClass, predicate);
-    const auto item = platform::openBeneath(entry.parent, entry.name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
-    if (!item && (item.error() == ENOENT || item.error() == ELOOP || item.error() == ENXIO))
+        return setClassOf(entry.directory, path, protectionClass,
+                          [&](int current) { return predicate(entry.status, current); });
+    const auto item =
+        platform::openBeneathOnMount(entry.parent, entry.name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
+    // Gone, a link, something without a reader, or the place of a mount.
+    if (!item && (item.error() == ENOENT || item.error() == ELOOP || item.error() == ENXIO || item.error() == EXDEV))
         return {};
     struct stat status{};
     if (!item || ::fstat(item->get(), &status) != 0) {
         const int number = item ? errno : item.error();
         return posixError(ZOR_HERE, number, "Failed to open %s : %s", ZOR_SHOWN(path), errorText(number));
     }
-    if (status.st_ino != entry.status.st_ino || status.st_dev != entry.status.st_dev)
+    if (!S_ISREG(status.st_mode))
         return {};
-    return setClassOf(item->get(), path, protectionClass, predicate);
+    return setClassOf(item->get(), path, protectionClass, [&](int current) { return predicate(status, current); });
 }
 
 Result<void> ZORFileManager::setClassOf(int fd, const std::string& path, int protectionClass,

@@ -90,16 +90,20 @@ public:
     // Existence. An item that cannot be examined neither exists nor does not exist.
     [[nodiscard]] bool itemExistsAtURL(const FileURL& url);
     [[nodiscard]] bool itemDoesNotExistAtURL(const FileURL& url);
+    /// The same of an item below a directory that is open, for who asks of very many; `url` names it in messages.
+    [[nodiscard]] bool itemDoesNotExistBelow(int directory, const char* relativePath, const FileURL& url);
 
     // Data protection.
     Result<int> dataProtectionClassOfItemAtURL(const FileURL& url);
     /// `predicate` gets the current class and says whether to set; without one, always.
     Result<void> setDataProtectionClassOfItemAtURL(const FileURL& url, int protectionClass,
                                                    const std::function<bool(int)>& predicate = nullptr);
-    /// The same for a directory or regular file that a walk has met; `path` names it in messages. What is no longer
-    /// what the walk met is left alone, as if it had gone before.
-    Result<void> setDataProtectionClassOfEntry(const fs::WalkEntry& entry, const std::string& path, int protectionClass,
-                                               const std::function<bool(int)>& predicate);
+    /// The same for a directory or regular file that a walk has met; `path` names it in messages. What is opened
+    /// counts, and `predicate` gets its status too: what is of another kind by now is left alone, as if it had gone
+    /// before.
+    Result<void>
+    setDataProtectionClassOfEntry(const fs::WalkEntry& entry, const std::string& path, int protectionClass,
+                                  const std::function<bool(const struct stat& status, int current)>& predicate);
 
     [[nodiscard]] const fs::PathResolver& resolver() const { return resolver_; }
     [[nodiscard]] platform::Disk& disk() { return disk_; }

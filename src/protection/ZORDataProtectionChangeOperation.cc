@@ -144,7 +144,7 @@ Result<void> ZORDataProtectionChangeOperation::walk(int container, const std::ve
     namesMet_.clear();
     std::optional<ZORError> failure;
     for (const Item& item : items) {
-        fs::TreeWalker walker;
+        fs::TreeWalker walker(fs::WalkStatus::typeOnly);
         const int status = walker.walk(container, item.name.c_str(), [&](const WalkEntry& entry) {
             if (auto visited = visit(entry, item); !visited) {
                 failure = std::move(visited).error();
@@ -184,35 +184,39 @@ Result<void> ZORDataProtectionChangeOperation::visit(const WalkEntry& entry, con
 }
 
 Result<void> ZORDataProtectionChangeOperation::changeDirectory(const WalkEntry& entry, const std::string& path) {
-    return setClass(entry, path, newDataProtectionClass_, [](int current) { return current == untouchableClass; });
+    return setClass(entry, path, newDataProtectionClass_,
+                    [](const struct stat&, int current) { return current == untouchableClass; });
 }
 
 Result<void> ZORDataProtectionChangeOperation::changeFile(const WalkEntry& entry, const std::string& path) {
-    // A file with a name elsewhere may be somebody else's too.
-    if (entry.status.st_nlink > 1 && !allNamesMet(entry.status))
-        return {};
     const std::int32_t target = newDataProtectionClass_ == 0 ? classOfFilesForNone : newDataProtectionClass_;
     const bool keepLower = (operationType_ & protectionChange::keepLower) != 0;
-    return setClass(entry, path, target, [target, keepLower](int current) {
+    return setClass(entry, path, target, [this, target, keepLower](const struct stat& status, int current) {
+        // A file with a name elsewhere may be somebody else's too.
+        if (status.st_nlink > 1 && !allNamesMet(status))
+            return true;
         return current == target || current == untouchableClass || (keepLower && target > current);
     });
 }
 
 Result<void> ZORDataProtectionChangeOperation::setClass(const WalkEntry& entry, const std::string& path,
-                                                        std::int32_t target, const std::function<bool(int)>& declines) {
-    auto set = services_.fileManager.setDataProtectionClassOfEntry(entry, path, target, [&](int current) {
-        if (declines(current))
-            return false;
-        if (services_.log.writes(logLevelDebug))
-            services_.log.write(logLevelDebug, passFunction, "Setting protection class of %s to %d", ZOR_SHOWN(path),
-                                target);
-        return true;
-    });
+                                                        std::int32_t target, const Declines& declines) {
+    mode_t mode = 0;
+    auto set = services_.fileManager.setDataProtectionClassOfEntry(
+        entry, path, target, [&](const struct stat& status, int current) {
+            mode = status.st_mode;
+            if (declines(status, current))
+                return false;
+            if (services_.log.writes(logLevelDebug))
+                services_.log.write(logLevelDebug, passFunction, "Setting protection class of %s to %d",
+                                    ZOR_SHOWN(path), target);
+            return true;
+        });
     if (set || !set.error().isPosix(EBADF))
         return set;
     services_.log.write(logLevelError, passFunction,
                         "Ignoring failure to set protection class to %d on %s (mode 0%o): %s", target, ZOR_SHOWN(path),
-                        entry.status.st_mode, set.error().text().c_str());
+                        mode, set.error().text().c_str());
     return {};
 }
 

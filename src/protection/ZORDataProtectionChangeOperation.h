@@ -80,8 +80,9 @@ private:
     Result<void> visit(const fs::WalkEntry& entry, const Item& item);
     Result<void> changeDirectory(const fs::WalkEntry& entry, const std::string& path);
     Result<void> changeFile(const fs::WalkEntry& entry, const std::string& path);
+    using Declines = std::function<bool(const struct stat& status, int current)>;
     Result<void> setClass(const fs::WalkEntry& entry, const std::string& path, std::int32_t target,
-                          const std::function<bool(int)>& declines);
+                          const Declines& declines);
     [[nodiscard]] bool allNamesMet(const struct stat& status);
 
     StoreServices& services_;

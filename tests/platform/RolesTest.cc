@@ -198,6 +198,34 @@ TEST(DeviceLockState, ReadsANumberOrNothing) {
     EXPECT_EQ(state.currentState(), -1);
 }
 
+// Goal: what is kept of a file that was left alone for a while does not outlive a change of any kind. Method: a state
+// of each kind waits until it may be kept, is read, and is changed in one of the ways.
+TEST(DeviceLockState, ForgetsWhatItKeptOfAFileThatChanges) {
+    const std::string name = std::string(names::runtimeDirectory) + "/" + names::lockState;
+    struct Case {
+        TestRoot test{};
+        FileDeviceLockState state{test.root()};
+    };
+    Case replaced;
+    Case rewritten;
+    Case removed;
+    const std::vector<Case*> cases = {&replaced, &rewritten, &removed};
+    for (Case* one : cases)
+        one->test.replace(name, "3");
+    ::usleep(2'100'000);
+    for (Case* one : cases)
+        EXPECT_EQ(one->state.currentState(), 3);
+    replaced.test.replace(name, "1");
+    EXPECT_EQ(replaced.state.currentState(), 1);
+    const FileDescriptor open(::open(rewritten.test.path(name).c_str(), O_WRONLY | O_CLOEXEC));
+    ASSERT_EQ(::pwrite(open.get(), "2", 1, 0), 1);
+    EXPECT_EQ(rewritten.state.currentState(), 2);
+    ::unlink(removed.test.path(name).c_str());
+    EXPECT_EQ(removed.state.currentState(), 0);
+    removed.test.replace(name, "4");
+    EXPECT_EQ(removed.state.currentState(), 4);
+}
+
 // Goal: every change reaches the loop, by rename, by removal and by writing in place; other files of the directory do
 // not.
 TEST(DeviceLockState, TellsChanges) {

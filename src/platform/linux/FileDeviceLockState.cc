@@ -16,6 +16,9 @@ namespace zor::platform {
 namespace {
 
 constexpr std::size_t stateBytesMax = 32;
+/// A file that was changed twice within one tick of the kernel's clock looks the same after both; one that was left
+/// alone for as long as this will not.
+constexpr time_t settledSeconds = 1;
 constexpr std::uint32_t watchedEvents = IN_MOVED_TO | IN_MOVED_FROM | IN_CREATE | IN_DELETE | IN_CLOSE_WRITE;
 
 int parseState(std::string_view text) {
@@ -28,12 +31,41 @@ int parseState(std::string_view text) {
 
 } // namespace
 
+bool FileDeviceLockState::Known::isOf(const struct stat& status) const {
+    return device == status.st_dev && inode == status.st_ino && bytes == status.st_size &&
+           changed.tv_sec == status.st_ctim.tv_sec && changed.tv_nsec == status.st_ctim.tv_nsec;
+}
+
 int FileDeviceLockState::currentState() const {
+    struct stat status{};
+    if (::fstatat(root_.runtimeDirectory(), names::lockState, &status, AT_SYMLINK_NOFOLLOW) != 0)
+        return errno == ENOENT ? 0 : unknown;
+    {
+        const MutexLock held(mutex_);
+        if (known_ && known_->isOf(status))
+            return known_->state;
+    }
+    return readState();
+}
+
+int FileDeviceLockState::readState() const {
     const auto file = openBeneath(root_.runtimeDirectory(), names::lockState, O_RDONLY | O_NONBLOCK);
     if (!file)
         return file.error() == ENOENT ? 0 : unknown;
+    struct stat status{};
+    timespec now{};
+    const bool examined = ::fstat(file->get(), &status) == 0 && ::clock_gettime(CLOCK_REALTIME, &now) == 0;
     const auto text = readSmallFile(file->get(), stateBytesMax);
-    return text ? parseState(*text) : unknown;
+    const int state = text ? parseState(*text) : unknown;
+    const MutexLock held(mutex_);
+    known_.reset();
+    if (examined && status.st_ctim.tv_sec + settledSeconds < now.tv_sec)
+        known_ = {.device = status.st_dev,
+                  .inode = status.st_ino,
+                  .bytes = status.st_size,
+                  .changed = status.st_ctim,
+                  .state = state};
+    return state;
 }
 
 const char* FileDeviceLockState::notificationName() const {

@@ -2,12 +2,18 @@
 // The lock state as the number in run/zorvane/lockstate, which whoever manages the lock replaces by rename.
 //
 // No file is 0, unlocked. A file that holds no number is -1: neither locked nor unlocked, so nothing that waits for an
-// unlock starts, and nothing begins to wait for one that may never be said. Any thread.
+// unlock starts, and nothing begins to wait for one that may never be said. What was read is kept for as long as the
+// file is the same and unchanged, which is looked up each time: a change of protection class asks for every file. Any
+// thread.
 #pragma once
 
 #include "platform/DeviceLockState.h"
 #include "platform/FileDescriptor.h"
+#include "platform/Mutex.h"
 #include "platform/linux/SystemRoot.h"
+
+#include <optional>
+#include <sys/stat.h>
 
 namespace zor::platform {
 
@@ -23,10 +29,23 @@ public:
     [[nodiscard]] const char* notificationName() const override;
 
 private:
+    /// The state that a file holds, and by what it is known again.
+    struct Known {
+        dev_t device;
+        ino_t inode;
+        off_t bytes;
+        timespec changed;
+        int state;
+
+        [[nodiscard]] bool isOf(const struct stat& status) const;
+    };
+    [[nodiscard]] int readState() const;
     [[nodiscard]] bool takeEvents() const;
 
     const SystemRoot& root_;
     FileDescriptor inotify_;
+    mutable Mutex mutex_;
+    mutable std::optional<Known> known_ ZOR_GUARDED_BY(mutex_);
 };
 
 } // namespace zor::platform
