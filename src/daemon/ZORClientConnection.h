@@ -240,7 +240,8 @@ private:
 
     void runDeletionPass(const std::function<void(ErrorCode)>& completion);
     std::optional<ZORError> deleteEverythingOnDeathRow();
-    bool isOrphan(const FileURL& entry, ContainerClass containerClass);
+    /// `classDirectory` is open and holds the entry.
+    bool isOrphan(int classDirectory, const FileURL& entry, ContainerClass containerClass);
     void reportOrphan(const FileURL& entry);
     // Passes of the setup; each gives the number of items it changed.
     std::uint64_t migrateBundles();

@@ -113,7 +113,7 @@ std::uint64_t ZORClientConnection::cleanUpUsers() {
     return removed;
 }
 
-bool ZORClientConnection::isOrphan(const FileURL& entry, ContainerClass containerClass) {
+bool ZORClientConnection::isOrphan(int classDirectory, const FileURL& entry, ContainerClass containerClass) {
     const std::string_view name = entry.lastPathComponent();
     // An identifier of the table whose container goes by another name is a name all the same: what lies there is not
     // ours to judge by a table that may have changed.
@@ -121,7 +121,8 @@ bool ZORClientConnection::isOrphan(const FileURL& entry, ContainerClass containe
                             services_.whitelist.directoryNameIsWellknown(name, containerClass);
     if (!acceptable)
         return true;
-    if (!services_.fileManager.itemDoesNotExistAtURL(entry.appendingFile(names::metadataFile)))
+    const std::string metadata = std::string(name) + "/" + names::metadataFile;
+    if (!services_.fileManager.itemDoesNotExistBelow(classDirectory, metadata.c_str(), entry))
         return false;
     services_.log.write(logLevelError, "_cleanupOrphanedDataForUser",
                         "Deleting orphaned data missing a metadata file at: %s", entry.c_str());
@@ -147,9 +148,15 @@ std::uint64_t ZORClientConnection::_cleanupOrphanedDataForUser(std::uint32_t use
                                 entries.error().text().c_str());
         return 0;
     }
+    const auto opened = services_.fileManager.resolver().openDirectoryPath(*directory);
+    if (!opened) {
+        services_.log.write(logLevelError, __func__, "Failed to get items at %s : %s", directory->c_str(),
+                            errorText(opened.error()));
+        return 0;
+    }
     std::uint64_t removed = 0;
     for (const FileURL& entry : *entries) {
-        if (!isOrphan(entry, containerClass))
+        if (!isOrphan(opened->get(), entry, containerClass))
             continue;
         if (services_.internalBuild.isInternalBuild())
             reportOrphan(entry);
