@@ -23,6 +23,12 @@ std::vector<Figure> measureRun(const Settings& settings);
 std::vector<Figure> measureCreate(const Settings& settings);
 /// The first look into a class with many containers: ClassBench.cc.
 std::vector<Figure> measureClass(const Settings& settings);
+/// The data-protection class of a container's content is changed: ProtectionBench.cc.
+std::vector<Figure> measureProtection(const Settings& settings);
+/// A container with many files is measured and removed: TreeBench.cc.
+std::vector<Figure> measureTree(const Settings& settings);
+/// The first launch after a boot: BootBench.cc.
+std::vector<Figure> measureBoot(const Settings& settings);
 /// What the daemon costs when nobody asks, and until it answers: LifeBench.cc.
 std::vector<Figure> measureStart(const Settings& settings);
 /// What it costs after it was asked very often: LifeBench.cc.

@@ -40,27 +40,39 @@ std::string ClassTree::identifier(int index) {
     return text("com.example.application.%07d", index);
 }
 
-double ClassTree::readAll() const {
+template <typename Look>
+double ClassTree::forEach(Look&& look) const {
     const auto begin = Clock::now();
     const std::unique_ptr<DIR, int (*)(DIR*)> stream(::opendir(directory_.c_str()), ::closedir);
     if (!stream)
         failWithErrno(directory_);
-    std::array<char, 4096> buffer;
     int found = 0;
     while (const dirent* entry = ::readdir(stream.get())) {
         if (entry->d_name[0] == '.')
             continue;
         char path[NAME_MAX + 64];
         std::snprintf(path, sizeof path, "%s/%s", entry->d_name, names::metadataFile);
-        const FileDescriptor file(::openat(::dirfd(stream.get()), path, O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
-        struct stat status{};
-        if (!file.valid() || ::fstat(file.get(), &status) != 0 || ::read(file.get(), buffer.data(), buffer.size()) <= 0)
+        if (!look(::dirfd(stream.get()), path))
             failWithErrno(path);
         ++found;
     }
     if (found != count_)
         throw Failure(text("%d containers in %s instead of %d", found, directory_.c_str(), count_));
     return secondsSince(begin);
+}
+
+double ClassTree::readAll() const {
+    std::array<char, 4096> buffer;
+    return forEach([&](int directory, const char* path) {
+        const FileDescriptor file(::openat(directory, path, O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+        struct stat status{};
+        return file.valid() && ::fstat(file.get(), &status) == 0 &&
+               ::read(file.get(), buffer.data(), buffer.size()) > 0;
+    });
+}
+
+double ClassTree::lookAtAll() const {
+    return forEach([](int directory, const char* path) { return ::faccessat(directory, path, F_OK, 0) == 0; });
 }
 
 } // namespace zor::bench

@@ -22,8 +22,13 @@ public:
     /// The floor: opens, examines, reads and closes every metadata file, in the directory's order. Seconds that it
     /// took.
     [[nodiscard]] double readAll() const;
+    /// The floor of looking for containers without one: asks of every metadata file whether it is there.
+    [[nodiscard]] double lookAtAll() const;
 
 private:
+    template <typename Look>
+    double forEach(Look&& look) const;
+
     const std::string directory_;
     const int count_;
 };

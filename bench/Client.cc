@@ -4,7 +4,6 @@
 #include "Processes.h"
 #include "Statistics.h"
 #include "ipc/Frame.h"
-#include "ipc/Keys.h"
 #include "plist/Binary.h"
 
 #include <algorithm>
@@ -26,15 +25,19 @@ constexpr std::uint64_t requestId = 1;
 } // namespace
 
 Frame containerRequest(const std::string& identifier, ContainerClass containerClass, Create create) {
-    plist::Dictionary request{
-        {std::string(ipc::keys::command), static_cast<std::uint64_t>(ipc::Command::createOrLookupContainer)},
-        {std::string(ipc::keys::containerClass), static_cast<std::uint64_t>(containerClass)},
-        {std::string(ipc::keys::userId), userId},
-        {std::string(ipc::keys::identifier), identifier},
-    };
+    plist::Dictionary rest;
     if (create == Create::yes)
-        request.set(ipc::keys::createIfNecessary, true);
-    return requestFrame(request);
+        rest.set(ipc::keys::createIfNecessary, true);
+    return containerFrame(ipc::Command::createOrLookupContainer, identifier, containerClass, std::move(rest));
+}
+
+Frame containerFrame(ipc::Command command, const std::string& identifier, ContainerClass containerClass,
+                     plist::Dictionary rest) {
+    rest.set(ipc::keys::command, static_cast<std::uint64_t>(command));
+    rest.set(ipc::keys::containerClass, static_cast<std::uint64_t>(containerClass));
+    rest.set(ipc::keys::userId, userId);
+    rest.set(ipc::keys::identifier, identifier);
+    return requestFrame(rest);
 }
 
 Frame requestFrame(const plist::Dictionary& request) {
@@ -120,6 +123,27 @@ void mustSucceed(std::span<const std::uint8_t> frame, bool existed) {
         return;
     const plist::Value value(reply);
     throw Failure("unexpected reply: " + plist::describe(&value));
+}
+
+plist::Dictionary succeed(Client& client, const Frame& request) {
+    plist::Dictionary reply = replyOf(client.exchange(request));
+    if (reply.unsignedInteger(ipc::keys::replyError) == ipc::replySuccess)
+        return reply;
+    const plist::Value value(reply);
+    throw Failure("a request failed: " + plist::describe(&value));
+}
+
+Container makeContainer(Client& client, const std::string& identifier, ContainerClass containerClass,
+                        Lifetime lifetime) {
+    const plist::Dictionary reply =
+        succeed(client, containerFrame(ipc::Command::createOrLookupContainer, identifier, containerClass,
+                                       {{std::string(ipc::keys::createIfNecessary), true},
+                                        {std::string(ipc::keys::transient), lifetime == Lifetime::transient}}));
+    const std::string* path = reply.string(ipc::keys::replyPath);
+    const plist::Value* uuid = reply.find(ipc::keys::replyUUID);
+    if (!path || !uuid || reply.isTrue(ipc::keys::replyExisted))
+        throw Failure("a container was not made: " + identifier);
+    return {.path = *path, .uuid = *uuid};
 }
 
 } // namespace zor::bench

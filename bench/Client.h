@@ -4,6 +4,7 @@
 #pragma once
 
 #include "daemon/base/ContainerClass.h"
+#include "ipc/Keys.h"
 #include "platform/FileDescriptor.h"
 #include "plist/Value.h"
 
@@ -24,6 +25,9 @@ constexpr std::uint32_t userId = 501;
 enum class Create { no, yes };
 /// A whole frame: find the container, or make it.
 [[nodiscard]] Frame containerRequest(const std::string& identifier, ContainerClass containerClass, Create create);
+/// The same of an action on a container that is named by user, class and identifier, with what else it takes.
+[[nodiscard]] Frame containerFrame(ipc::Command command, const std::string& identifier, ContainerClass containerClass,
+                                   plist::Dictionary rest = {});
 
 class Client {
 public:
@@ -51,5 +55,16 @@ private:
 [[nodiscard]] plist::Dictionary replyOf(std::span<const std::uint8_t> frame);
 /// A failure unless the reply says that the command did what it was asked, on a container that was there or not.
 void mustSucceed(std::span<const std::uint8_t> frame, bool existed);
+/// The reply to a request; a failure unless the command did what it was asked.
+plist::Dictionary succeed(Client& client, const Frame& request);
+
+struct Container {
+    std::string path;
+    plist::Value uuid;
+};
+enum class Lifetime { live, transient };
+/// Makes one, which is not there yet.
+Container makeContainer(Client& client, const std::string& identifier, ContainerClass containerClass,
+                        Lifetime lifetime = Lifetime::live);
 
 } // namespace zor::bench

@@ -59,15 +59,18 @@ void prepareRoot(const Settings& settings, const std::string& root) {
         "root:x:0:0:root:/private/var/root:/bin/sh\nmobile:x:501:501:User:/" + std::string(home) + ":/bin/sh\n";
     writeFile(root + "/" + platform::names::passwordFile,
               {reinterpret_cast<const std::uint8_t*>(passwords.data()), passwords.size()});
-    const plist::Dictionary entry{
-        {"Identifier", benchIdentifier},
-        {"Executable", settings.ownProgram},
-        {"Entitlements", plist::Dictionary{{std::string(platform::entitlementKeys::allowed), true}}},
-    };
+    admitProgram(root, "bench",
+                 {{"Identifier", benchIdentifier},
+                  {"Executable", settings.ownProgram},
+                  {"Entitlements", plist::Dictionary{{std::string(platform::entitlementKeys::allowed), true}}}});
+}
+
+void admitProgram(const std::string& root, const std::string& name, const plist::Dictionary& entry) {
     const auto bytes = plist::writeBinary(entry);
     if (!bytes)
         throw Failure("a registry entry cannot be written");
-    writeFile(root + "/" + platform::names::identityDirectory + "/bench" + platform::names::identityFileSuffix, *bytes);
+    writeFile(root + "/" + platform::names::identityDirectory + "/" + name + platform::names::identityFileSuffix,
+              *bytes);
 }
 
 std::string makeClassDirectory(const std::string& root, ContainerClass containerClass) {
@@ -101,11 +104,13 @@ Daemon::Daemon(const Settings& settings, const std::string& root, const Options&
             ::unsetenv("ZORVANE_DURABILITY");
         if (options.syncCounter)
             options.syncCounter->watchThisProcess();
-        ::execl(settings.daemonProgram.c_str(), "zorvaned", "--root", root.c_str(), static_cast<char*>(nullptr));
+        ::execl(settings.daemonProgram.c_str(), "zorvaned", "--root", root.c_str(),
+                options.forgetBoot ? "--forget-boot" : nullptr, static_cast<char*>(nullptr));
     });
     if (options.syncCounter)
         options.syncCounter->start();
     waitUntilReady(notices.get());
+    readySeconds_ = secondsSince(startedAt_);
 }
 
 void Daemon::waitUntilReady(int notices) {
@@ -136,6 +141,14 @@ Daemon::~Daemon() {
 
 Client Daemon::connect() const {
     return {socketDirectory_, ipc::serviceName};
+}
+
+plist::Dictionary Daemon::counters() const {
+    const plist::Dictionary status = replyOf(Client(socketDirectory_, ipc::statusSocketName).receive());
+    const plist::Dictionary* counters = status.dictionary(ipc::keys::statusCounters);
+    if (!counters)
+        throw Failure("the daemon's status has no counters");
+    return *counters;
 }
 
 double Daemon::residentKiB() const {

@@ -29,6 +29,8 @@ struct Settings {
 inline constexpr const char* benchIdentifier = "com.veltra.zorvane-bench";
 /// Makes what a daemon needs to find below `root`, which exists and is empty.
 void prepareRoot(const Settings& settings, const std::string& root);
+/// Enters a program into the registry of a root.
+void admitProgram(const std::string& root, const std::string& name, const plist::Dictionary& entry);
 /// The class directory of `userId` in a root, made with the owner that the daemon gives it.
 std::string makeClassDirectory(const std::string& root, ContainerClass containerClass);
 
@@ -39,6 +41,7 @@ public:
         Syncs syncs = Syncs::off;
         std::optional<int> processor{};     // pins all of it
         SyncCounter* syncCounter = nullptr; // sees its syncs from the start on
+        bool forgetBoot = false;            // its launch is the first after a boot
     };
     /// Starts it on the root and returns when it serves clients.
     Daemon(const Settings& settings, const std::string& root, const Options& options);
@@ -51,6 +54,10 @@ public:
     [[nodiscard]] const std::string& socketDirectory() const { return socketDirectory_; }
     /// Just before the process was made.
     [[nodiscard]] Clock::time_point startedAt() const { return startedAt_; }
+    /// How long it took from then until it served clients.
+    [[nodiscard]] double readySeconds() const { return readySeconds_; }
+    /// Its counters, as the status socket tells them.
+    [[nodiscard]] plist::Dictionary counters() const;
     [[nodiscard]] double processorSeconds() const { return process_->processorSeconds(); }
     [[nodiscard]] double residentKiB() const;
     [[nodiscard]] int descriptorCount() const;
@@ -60,6 +67,7 @@ private:
 
     const std::string socketDirectory_;
     Clock::time_point startedAt_;
+    double readySeconds_ = 0;
     std::unique_ptr<ChildProcess> process_;
 };
 

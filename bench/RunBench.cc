@@ -5,13 +5,9 @@
 
 #include "entitlements/ZOREntitlementMapping.h"
 #include "ipc/Keys.h"
-#include "platform/linux/Names.h"
-#include "plist/Binary.h"
 
 #include <array>
 #include <cstdio>
-#include <fcntl.h>
-#include <fstream>
 #include <nlohmann/json.hpp>
 #include <unistd.h>
 
@@ -22,22 +18,6 @@ namespace {
 constexpr const char* identifier = "com.example.application.run";
 constexpr const char* bubblewrap = "/usr/bin/bwrap";
 constexpr const char* program = "/bin/true";
-
-void admitLauncher(const std::string& root, const std::string& launcher) {
-    const plist::Dictionary entry{{"Identifier", "com.veltra.zorvane-run"},
-                                  {"Executable", launcher},
-                                  {"KernelAgent", true},
-                                  {"Entitlements", plist::Dictionary()}};
-    const auto bytes = plist::writeBinary(entry);
-    if (!bytes)
-        throw Failure("a registry entry cannot be written");
-    std::ofstream file(root + "/" + platform::names::identityDirectory + "/run" + platform::names::identityFileSuffix,
-                       std::ios::binary);
-    file.write(reinterpret_cast<const char*>(bytes->data()), static_cast<std::streamsize>(bytes->size()));
-    file.close();
-    if (!file)
-        throw Failure("a registry entry cannot be written");
-}
 
 void registerGroups(const Daemon& daemon) {
     Client client = daemon.connect();
@@ -117,7 +97,11 @@ std::vector<Figure> measureRun(const Settings& settings) {
         return {figure};
     const Place place(*settings.scratch, "run", {.bytes = std::uint64_t{256} << 20, .inodes = 16384});
     prepareRoot(settings, place.path());
-    admitLauncher(place.path(), launcher);
+    admitProgram(place.path(), "run",
+                 {{"Identifier", "com.veltra.zorvane-run"},
+                  {"Executable", launcher},
+                  {"KernelAgent", true},
+                  {"Entitlements", plist::Dictionary()}});
     const Daemon daemon(settings, place.path(), {});
     registerGroups(daemon);
     const auto command = launch(launcher, place.path());

@@ -146,9 +146,13 @@ Place::~Place() {
     std::filesystem::remove_all(path_, ignored);
 }
 
-bool dropCaches(const std::string& path) {
+void writeOut(const std::string& path) {
     const FileDescriptor place(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     ::syncfs(place.get());
+}
+
+bool dropCaches(const std::string& path) {
+    writeOut(path);
     const FileDescriptor control(::open("/proc/sys/vm/drop_caches", O_WRONLY | O_CLOEXEC));
     return control.valid() && ::write(control.get(), "3", 1) == 1;
 }

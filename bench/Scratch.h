@@ -61,7 +61,9 @@ private:
     bool mounted_ = false;
 };
 
-/// Writes out the file system of `path` and drops what the kernel keeps of any disk in memory. False when this process
+/// Writes out the file system of `path`: what was made before is not to be written while something is measured.
+void writeOut(const std::string& path);
+/// The same, and drops what the kernel keeps of any disk in memory. False when this process
 /// may not.
 bool dropCaches(const std::string& path);
 

@@ -44,19 +44,18 @@ void must(long result) {
         failWithErrno("the floor of making a container");
 }
 
-/// What the daemon uses: the second where this process may not use the first.
-const char* chooseAttribute(int directory) {
+} // namespace
+
+const char* protectionAttributeOn(int directory) {
     return ::fsetxattr(directory, platform::names::protectionAttribute, "0", 1, 0) == 0
                ? platform::names::protectionAttribute
                : platform::names::protectionAttributeUser;
 }
 
-} // namespace
-
 TreeFloor::TreeFloor(const std::string& place, Syncs syncs)
     : syncs_(syncs), changesOwner_(::geteuid() == 0), content_(metadata()),
       staging_(makeAndOpen(place + "/floor/Staging")), live_(makeAndOpen(place + "/floor/Data/Application")) {
-    attribute_ = chooseAttribute(staging_.get());
+    attribute_ = protectionAttributeOn(staging_.get());
 }
 
 double TreeFloor::create() {

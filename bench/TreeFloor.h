@@ -11,6 +11,9 @@
 
 namespace zor::bench {
 
+/// The attribute in which the daemon keeps protection classes: the second where this process may not use the first.
+[[nodiscard]] const char* protectionAttributeOn(int directory);
+
 class TreeFloor {
 public:
     enum class Syncs { off, on };

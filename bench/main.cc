@@ -29,7 +29,7 @@ Measures the daemon beside this program and prints each figure with its goal.
 
   --quick       fewer repetitions and smaller stores; under a minute
   --only NAME   one group: lookup, registration, throughput, upcall, create, class,
-                start, endurance, run
+                protection, boot, tree, start, endurance, run
   --json FILE   write the figures to FILE, too
 
 As root it measures on file systems made for the run; others use a directory.
@@ -52,6 +52,9 @@ constexpr Group groups[] = {
     {"upcall", measureUpcall},
     {"create", measureCreate},
     {"class", measureClass},
+    {"protection", measureProtection},
+    {"boot", measureBoot},
+    {"tree", measureTree},
     {"start", measureStart},
     {"endurance", measureEndurance},
     {"run", measureRun},
