@@ -25,8 +25,9 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* bytes, std::size_t siz
     static const ContainerPlace place(FileURL::directory("/private/var/mobile/Containers/Data/Application/X"));
     const auto record = parseMetadata({bytes + 1, size - 1}, place, userId, check);
     if (!record) {
-        require(record.error().is(ErrorCode::metadataUnreadable) || record.error().is(ErrorCode::metadataInvalid));
-        require(record.error().description().has_value());
+        const ZORError& error = record.error().error;
+        require(error.is(ErrorCode::metadataUnreadable) || error.is(ErrorCode::metadataInvalid));
+        require(error.description().has_value());
         return 0;
     }
     require(isValidClass((*record)->containerClass()));
