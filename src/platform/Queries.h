@@ -3,7 +3,7 @@
 #pragma once
 
 #include <cstdint>
-#include <optional>
+#include <expected>
 #include <string>
 #include <string_view>
 
@@ -32,8 +32,10 @@ struct PasswordEntry {
 class PasswordDatabase {
 public:
     virtual ~PasswordDatabase() = default;
-    [[nodiscard]] virtual std::optional<PasswordEntry> entryForUserId(std::uint32_t uid) const = 0;
-    [[nodiscard]] virtual std::optional<PasswordEntry> entryForName(std::string_view name) const = 0;
+    /// ENOENT where the database has no such entry, or one without an absolute home; any other errno where it could not
+    /// be asked.
+    [[nodiscard]] virtual std::expected<PasswordEntry, int> entryForUserId(std::uint32_t uid) const = 0;
+    [[nodiscard]] virtual std::expected<PasswordEntry, int> entryForName(std::string_view name) const = 0;
 };
 
 } // namespace zor::platform

@@ -4,6 +4,7 @@
 #include "daemon/base/UserIdentity.h"
 #include "store/StorePlaces.h"
 
+#include <cerrno>
 #include <climits>
 #include <cstdlib>
 
@@ -26,21 +27,27 @@ ZORPerUserConfiguration::initWithUserId(std::uint32_t userId, const Log& log, ZO
     return made;
 }
 
-std::optional<FileURL> ZORPerUserConfiguration::homeOf(const platform::PasswordDatabase& passwords,
-                                                       std::uint32_t userId) {
+std::expected<FileURL, int> ZORPerUserConfiguration::homeOf(const platform::PasswordDatabase& passwords,
+                                                            std::uint32_t userId) {
     const auto entry = passwords.entryForUserId(userId);
     if (!entry)
-        return std::nullopt;
+        return std::unexpected(entry.error());
     // A home may be reached through links that its administrator made; below it, none is followed.
     char resolved[PATH_MAX];
     const char* path = ::realpath(entry->homeDirectory.c_str(), resolved);
+    if (!path && isOwnShortage(errno))
+        return std::unexpected(errno);
     return FileURL::directory(path ? path : entry->homeDirectory);
 }
 
 std::optional<FileURL> ZORPerUserConfiguration::userHomeDirectory() {
     const RecursiveMutexLock held(lock_);
-    if (!userHomeDirectory_)
-        userHomeDirectory_ = homeOf(passwords_, userId_);
+    if (!homeIsLookedUp_) {
+        auto home = homeOf(passwords_, userId_);
+        homeIsLookedUp_ = home || !isOwnShortage(home.error());
+        if (home)
+            userHomeDirectory_ = std::move(*home);
+    }
     return userHomeDirectory_;
 }
 

@@ -11,6 +11,7 @@
 #include "platform/Mutex.h"
 #include "platform/Queries.h"
 
+#include <expected>
 #include <memory>
 #include <optional>
 
@@ -23,12 +24,12 @@ public:
                                                                    ZORFileManager& fileManager,
                                                                    const platform::PasswordDatabase& passwords);
 
-    /// The home that the password database names, without links; absent when it names none.
-    [[nodiscard]] static std::optional<FileURL> homeOf(const platform::PasswordDatabase& passwords,
+    /// The home that the password database names, without links; the database's errno when it names none.
+    [[nodiscard]] static std::expected<FileURL, int> homeOf(const platform::PasswordDatabase& passwords,
                                                        std::uint32_t userId);
 
     [[nodiscard]] std::uint32_t userId() const { return userId_; }
-    /// Asked for again as long as there is none: the database may have been out of reach, for want of descriptors say.
+    /// Looked up once; again where this process had no descriptors or memory left to ask with.
     [[nodiscard]] std::optional<FileURL> userHomeDirectory();
     /// Whether the home exists; makes nothing.
     [[nodiscard]] bool existsUserBaseDirectory();
@@ -48,7 +49,8 @@ private:
     ZORFileManager& fileManager_;
     const platform::PasswordDatabase& passwords_;
     platform::RecursiveMutex lock_;
-    std::optional<FileURL> userHomeDirectory_ ZOR_GUARDED_BY(lock_); // does not change once it is known
+    std::optional<FileURL> userHomeDirectory_ ZOR_GUARDED_BY(lock_);
+    bool homeIsLookedUp_ ZOR_GUARDED_BY(lock_) = false; // the database has answered; nothing changes any more
 };
 
 } // namespace zor

@@ -5,6 +5,7 @@
 #include "support/RecordingLog.h"
 
 #include <atomic>
+#include <cerrno>
 #include <gtest/gtest.h>
 #include <optional>
 #include <thread>
@@ -15,17 +16,18 @@ namespace {
 class CountingPasswords final : public platform::PasswordDatabase {
 public:
     explicit CountingPasswords(std::optional<std::uint32_t> mobile) : mobile_(mobile) {}
-    [[nodiscard]] std::optional<platform::PasswordEntry> entryForUserId(std::uint32_t) const override {
-        return std::nullopt;
+    [[nodiscard]] std::expected<platform::PasswordEntry, int> entryForUserId(std::uint32_t) const override {
+        return std::unexpected(ENOENT);
     }
-    [[nodiscard]] std::optional<platform::PasswordEntry> entryForName(std::string_view name) const override {
+    [[nodiscard]] std::expected<platform::PasswordEntry, int> entryForName(std::string_view name) const override {
         ++lookups;
         std::this_thread::sleep_for(std::chrono::milliseconds(5));
-        if (name != "mobile" || !mobile_)
-            return std::nullopt;
+        if (name != "mobile" || !mobile_ || failure != 0)
+            return std::unexpected(failure != 0 ? failure : ENOENT);
         return platform::PasswordEntry{.name = "mobile", .uid = *mobile_, .homeDirectory = "/private/var/mobile"};
     }
     mutable std::atomic<int> lookups{0};
+    int failure = 0;
 
 private:
     const std::optional<std::uint32_t> mobile_;
@@ -133,6 +135,21 @@ TEST(UserIdentity, TheMobileUserIsLookedUpOnce) {
         EXPECT_EQ(passwords.lookups, 1);
         const char* message = account ? "Current mobile user ID is 501" : "Failed to get mobile uid. This is bad";
         EXPECT_EQ(sink.take(), (std::vector<support::LogLine>{{3, "__getCurrentMobileUserId_block_invoke", message}}));
+    }
+}
+
+// Goal: what this process lacked when it asked does not stay the answer. Method: fail with each errno, then ask again.
+TEST(UserIdentity, AShortageIsNoAnswer) {
+    for (const auto& [failure, asked] : {std::pair(EMFILE, 2), std::pair(ENOMEM, 2), std::pair(EIO, 1)}) {
+        support::RecordingLog sink(logLevelNotice);
+        const Log log(sink);
+        CountingPasswords passwords(501);
+        UserIdentity users(log, passwords);
+        passwords.failure = failure;
+        EXPECT_EQ(users.getCurrentMobileUserId(), 0U);
+        passwords.failure = 0;
+        EXPECT_EQ(users.getCurrentMobileUserId(), asked == 2 ? 501U : 0U) << failure;
+        EXPECT_EQ(passwords.lookups, asked) << failure;
     }
 }
 

@@ -38,16 +38,21 @@ Result<std::uint32_t> UserIdentity::validateUserId(std::uint32_t requested, Cont
 }
 
 std::uint32_t UserIdentity::getCurrentMobileUserId() {
-    std::call_once(lookup_, [this] {
-        constexpr const char* function = "__getCurrentMobileUserId_block_invoke";
-        if (const auto entry = passwords_.entryForName("mobile")) {
-            mobileUserId_ = entry->uid;
-            log_.write(logLevelError, function, "Current mobile user ID is %u", mobileUserId_);
-        } else {
-            log_.write(logLevelError, function, "Failed to get mobile uid. This is bad");
-        }
-    });
-    return mobileUserId_;
+    constexpr const char* function = "__getCurrentMobileUserId_block_invoke";
+    if (const std::int64_t known = mobileUserId_; known != notLookedUp)
+        return static_cast<std::uint32_t>(known);
+    const platform::MutexLock held(lookup_);
+    if (const std::int64_t known = mobileUserId_; known != notLookedUp)
+        return static_cast<std::uint32_t>(known);
+    const auto entry = passwords_.entryForName("mobile");
+    if (entry)
+        log_.write(logLevelError, function, "Current mobile user ID is %u", entry->uid);
+    else
+        log_.write(logLevelError, function, "Failed to get mobile uid. This is bad");
+    const std::uint32_t userId = entry ? entry->uid : 0;
+    if (entry || !isOwnShortage(entry.error()))
+        mobileUserId_ = userId;
+    return userId;
 }
 
 } // namespace zor

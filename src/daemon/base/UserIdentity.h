@@ -4,10 +4,11 @@
 
 #include "daemon/base/ContainerClass.h"
 #include "daemon/base/Result.h"
+#include "platform/Mutex.h"
 #include "platform/Queries.h"
 
+#include <atomic>
 #include <cstdint>
-#include <mutex>
 
 namespace zor {
 
@@ -28,14 +29,16 @@ public:
     /// The user that a request acts on, or error 38 (logged). `requested` is the low 32 bits of what the client sent.
     [[nodiscard]] Result<std::uint32_t> validateUserId(std::uint32_t requested, ContainerClass containerClass,
                                                        std::uint32_t clientUserId);
-    /// The uid of the account "mobile", 0 when there is none. Looked up once; concurrent first callers wait for it.
+    /// The uid of the account "mobile", 0 when there is none. Looked up once, and again where this process had no
+    /// descriptors or memory left to ask with; concurrent first callers wait for it.
     [[nodiscard]] std::uint32_t getCurrentMobileUserId();
 
 private:
     const Log& log_;
     const platform::PasswordDatabase& passwords_;
-    std::once_flag lookup_;
-    std::uint32_t mobileUserId_ = 0; // written once inside lookup_, read after it
+    platform::Mutex lookup_; // held while the database is asked
+    static constexpr std::int64_t notLookedUp = -1;
+    std::atomic<std::int64_t> mobileUserId_{notLookedUp};
 };
 
 } // namespace zor

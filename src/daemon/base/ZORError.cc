@@ -6,12 +6,16 @@
 
 namespace zor {
 
+bool isOwnShortage(int errorNumber) {
+    return errorNumber == EMFILE || errorNumber == ENFILE || errorNumber == ENOMEM;
+}
+
 std::string ZORError::text() const {
     return formatted("%s %d \"%s\"", domainName(), code_, ZOR_SHOWN(description_));
 }
 
 bool ZORError::isOwnShortage() const {
-    return isPosix(EMFILE) || isPosix(ENFILE) || isPosix(ENOMEM);
+    return domain_ == ErrorDomain::posix && zor::isOwnShortage(code_);
 }
 
 void logError(const Log& log, const ZORError& error) {

@@ -20,6 +20,9 @@ struct Here {
 };
 #define ZOR_HERE (::zor::Here{__func__, __LINE__})
 
+/// This process ran out of descriptors or memory: the error says nothing about the item.
+[[nodiscard]] bool isOwnShortage(int errorNumber);
+
 class ZORError {
 public:
     ZORError(Here here, ErrorDomain domain, int code, std::optional<std::string> description,
@@ -39,7 +42,7 @@ public:
         return domain_ == ErrorDomain::zor && code_ == static_cast<int>(code);
     }
     [[nodiscard]] bool isPosix(int number) const { return domain_ == ErrorDomain::posix && code_ == number; }
-    /// This process ran out of descriptors or memory: the error says nothing about the item.
+    /// Whether its POSIX number is one of those.
     [[nodiscard]] bool isOwnShortage() const;
     /// What a client gets as "ReplyError": the code, sign-extended from 32 bits.
     [[nodiscard]] ErrorCode replyCode() const { return static_cast<ErrorCode>(static_cast<std::int64_t>(code_)); }

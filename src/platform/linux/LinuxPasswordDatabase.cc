@@ -23,62 +23,63 @@ struct FileCloser {
 
 /// Calls a getpw*_r function with a buffer that grows until the entry fits, and hands the entry on.
 template <typename Lookup, typename Convert>
-std::optional<PasswordEntry> lookUp(Lookup lookup, Convert convert) {
+std::expected<PasswordEntry, int> lookUp(Lookup lookup, Convert convert) {
     std::vector<char> buffer(entryBytesFirst);
     for (;;) {
         passwd entry{};
         passwd* found = nullptr;
         const int error = lookup(&entry, buffer.data(), buffer.size(), &found);
         if (error == 0)
-            return found ? convert(*found) : std::nullopt;
+            return found ? convert(*found) : std::unexpected(ENOENT);
         if (error == EINTR)
             continue;
         if (error != ERANGE || buffer.size() >= entryBytesMax)
-            return std::nullopt;
+            return std::unexpected(error);
         buffer.resize(buffer.size() * 2);
     }
 }
 
 } // namespace
 
-std::optional<PasswordEntry> LinuxPasswordDatabase::entryForUserId(std::uint32_t uid) const {
+std::expected<PasswordEntry, int> LinuxPasswordDatabase::entryForUserId(std::uint32_t uid) const {
     if (!root_.isDeviceRoot())
         return findInFile([uid](const passwd& entry) { return entry.pw_uid == uid; });
     return lookUp([uid](auto... rest) { return ::getpwuid_r(uid, rest...); },
                   [this](const passwd& found) { return entryOf(found); });
 }
 
-std::optional<PasswordEntry> LinuxPasswordDatabase::entryForName(std::string_view name) const {
+std::expected<PasswordEntry, int> LinuxPasswordDatabase::entryForName(std::string_view name) const {
     if (!root_.isDeviceRoot())
         return findInFile([name](const passwd& entry) { return name == entry.pw_name; });
     return lookUp([text = std::string(name)](auto... rest) { return ::getpwnam_r(text.c_str(), rest...); },
                   [this](const passwd& found) { return entryOf(found); });
 }
 
-std::optional<PasswordEntry>
+std::expected<PasswordEntry, int>
 LinuxPasswordDatabase::findInFile(const std::function<bool(const passwd&)>& matches) const {
     auto opened = openInRoot(root_.descriptor(), names::passwordFile, O_RDONLY | O_NONBLOCK);
     if (!opened)
-        return std::nullopt;
+        return std::unexpected(opened.error());
     const std::unique_ptr<std::FILE, FileCloser> file(::fdopen(opened->get(), "re"));
     if (!file)
-        return std::nullopt;
+        return std::unexpected(errno);
     (void)opened->release();
-    // A line longer than the buffer ends the search: no entry is that long, and behind it nothing can be trusted.
     std::vector<char> buffer(entryBytesMax);
     passwd entry{};
     passwd* found = nullptr;
-    while (::fgetpwent_r(file.get(), &entry, buffer.data(), buffer.size(), &found) == 0) {
+    int error;
+    while ((error = ::fgetpwent_r(file.get(), &entry, buffer.data(), buffer.size(), &found)) == 0) {
         if (matches(*found))
             return entryOf(*found);
     }
-    return std::nullopt;
+    // A line longer than the buffer ends the search: no entry is that long, and behind it nothing can be trusted.
+    return std::unexpected(error == ERANGE ? ENOENT : error);
 }
 
-std::optional<PasswordEntry> LinuxPasswordDatabase::entryOf(const passwd& found) const {
+std::expected<PasswordEntry, int> LinuxPasswordDatabase::entryOf(const passwd& found) const {
     const std::string_view home = found.pw_dir ? found.pw_dir : "";
     if (!home.starts_with('/'))
-        return std::nullopt;
+        return std::unexpected(ENOENT);
     return PasswordEntry{.name = found.pw_name, .uid = found.pw_uid, .homeDirectory = root_.path(home)};
 }
 

@@ -14,12 +14,12 @@ namespace zor::platform {
 class LinuxPasswordDatabase final : public PasswordDatabase {
 public:
     explicit LinuxPasswordDatabase(const SystemRoot& root) : root_(root) {}
-    [[nodiscard]] std::optional<PasswordEntry> entryForUserId(std::uint32_t uid) const override;
-    [[nodiscard]] std::optional<PasswordEntry> entryForName(std::string_view name) const override;
+    [[nodiscard]] std::expected<PasswordEntry, int> entryForUserId(std::uint32_t uid) const override;
+    [[nodiscard]] std::expected<PasswordEntry, int> entryForName(std::string_view name) const override;
 
 private:
-    [[nodiscard]] std::optional<PasswordEntry> findInFile(const std::function<bool(const passwd&)>& matches) const;
-    [[nodiscard]] std::optional<PasswordEntry> entryOf(const passwd& found) const;
+    [[nodiscard]] std::expected<PasswordEntry, int> findInFile(const std::function<bool(const passwd&)>& matches) const;
+    [[nodiscard]] std::expected<PasswordEntry, int> entryOf(const passwd& found) const;
 
     const SystemRoot& root_;
 };
