@@ -313,6 +313,7 @@ TEST_F(Replace, EveryStateOfTheTableIsRecovered) {
     };
     const std::array<std::string, 4> paths = {old, fresh, waiting, dest};
     const std::array<std::string, 4> preserving = {old, fresh, waiting, old};
+    const std::array<std::string, 4> behindLink = {applications + "/loop/x", fresh, waiting, dest};
     const Row rows[] = {
         {"not yet moved", {old, fresh}, paths, {{old, old}, {fresh, fresh}}, ": nothing had moved"},
         {"old moved", {waiting, fresh}, paths, {{old, waiting}, {fresh, fresh}}, ": the old one had moved"},
@@ -321,9 +322,12 @@ TEST_F(Replace, EveryStateOfTheTableIsRecovered) {
         {"both moved, preserving", {waiting, old}, preserving, {{old, old}}, ": both had moved"},
         {"staging gone", {dest}, paths, {{dest, dest}}, ": nothing was waiting any more"},
         {"staging gone, preserving", {old}, preserving, {{old, old}}, ": nothing was waiting any more"},
+        {"both moved, old behind a link", {waiting, dest}, behindLink, {{dest, dest}}, ": both had moved"},
         {"nothing left", {}, paths, {}, ": nothing is left"},
         {"a path missing", {waiting, fresh}, {old, "", waiting, dest}, {{fresh, fresh}}, "Invalid replace data"},
     };
+    world.makeDirectories(applications, mobile);
+    ASSERT_EQ(::symlink("elsewhere", world.path(applications + "/loop").c_str()), 0);
     for (const Row& row : rows) {
         SCOPED_TRACE(row.name);
         for (const std::string& place : row.there)

@@ -36,8 +36,8 @@ struct State {
 /// destination.
 constexpr State states[] = {
     {"nothing had moved", Expected::present, Expected::anything, Expected::anything, Recovery::nothing},
-    {"nothing was waiting any more", Expected::absent, Expected::present, Expected::absent, Recovery::nothing},
-    {"both had moved", Expected::absent, Expected::present, Expected::anything, Recovery::nothing},
+    {"nothing was waiting any more", Expected::anything, Expected::present, Expected::absent, Recovery::nothing},
+    {"both had moved", Expected::anything, Expected::present, Expected::anything, Recovery::nothing},
     {"nothing is left", Expected::absent, Expected::absent, Expected::absent, Recovery::nothing},
     {"the old one had moved", Expected::absent, Expected::absent, Expected::anything, Recovery::moveOldBack},
 };
