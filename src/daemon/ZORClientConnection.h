@@ -227,6 +227,7 @@ private:
     void recoverFromException(const ReplaceProgress& progress);
     std::optional<ZORError> cleanUpReplace(const ReplaceProgress& progress, StartDeletionThread startDeletionThread);
     Result<void> openDirectories(ReplaceProgress& progress, const FileURL& stagingUrl);
+    ZORError notInPlace(const ReplaceProgress& progress, const ZORError& cause);
     Result<void> recoverReplace(const FileURL& journalUrl);
     Result<void> applyReplaceJournal(const ReplaceJournal& journal);
 

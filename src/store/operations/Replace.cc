@@ -16,11 +16,14 @@
 // A replace whose second move fails has lost the old container, which went to death row. So everything that can be
 // looked at beforehand is: both directories can be opened, the destination is free.
 #include "daemon/ZORClientConnection.h"
+#include "platform/BlockingScope.h"
 #include "store/StoreServices.h"
 #include "store/operations/ReplaceJournal.h"
 
 #include <cerrno>
 #include <cstdlib>
+#include <iterator>
+#include <span>
 
 namespace zor {
 
@@ -91,10 +94,10 @@ Result<void> ZORClientConnection::checkedReplace(const ReplaceRequest& request,
     }();
     if (!swapped)
         return swapped;
-    if (const auto failed = syncDirectories({progress.destUrl.deletingLastPathComponent()}))
-        return makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::newNotMovedIntoPlace, &*failed,
-                         LogFlag::yes, "Failed to replace: %s with: %s at: %s", progress.oldUrl.c_str(),
-                         progress.newUrl.c_str(), progress.destUrl.c_str());
+    const platform::BlockingScope blocking;
+    if (const int synced = services_.durability.afterMove(progress.directories.dest.get()); synced < 0)
+        return notInPlace(progress, posixError({replaceFunction, __LINE__}, -synced, "sync of %s failed: %s",
+                                               progress.destUrl.c_str(), errorText(-synced)));
     return {};
 }
 
@@ -129,7 +132,15 @@ Result<void> ZORClientConnection::swapContainers(const ReplaceRequest& request, 
     TRY(prepareReplace(request, progress));
     if (progress.oldRecord)
         TRY(moveOldAway(request, progress));
+    else if (const auto opened = openDirectories(progress, {}); !opened)
+        return notInPlace(progress, opened.error());
     return putNewInPlace(request, progress);
+}
+
+ZORError ZORClientConnection::notInPlace(const ReplaceProgress& progress, const ZORError& cause) {
+    return makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::newNotMovedIntoPlace, &cause, LogFlag::yes,
+                     "Failed to replace: %s with: %s at: %s", progress.oldUrl.c_str(), progress.newUrl.c_str(),
+                     progress.destUrl.c_str());
 }
 
 Result<void> ZORClientConnection::prepareReplace(const ReplaceRequest& request, ReplaceProgress& progress) {
@@ -244,13 +255,15 @@ Result<void> ZORClientConnection::moveOldAway(const ReplaceRequest& request, Rep
 }
 
 Result<void> ZORClientConnection::openDirectories(ReplaceProgress& progress, const FileURL& stagingUrl) {
+    auto& directories = progress.directories;
     const std::pair<FileDescriptor*, FileURL> wanted[] = {
-        {&progress.directories.old, progress.oldUrl},
-        {&progress.directories.fresh, progress.newUrl},
-        {&progress.directories.staging, stagingUrl},
-        {&progress.directories.dest, progress.destUrl},
-        {&progress.directories.journals, services_.configuration.replaceDirectory().appendingFile("journal")}};
-    for (const auto& [descriptor, url] : wanted) {
+        {&directories.fresh, progress.newUrl},
+        {&directories.dest, progress.destUrl},
+        {&directories.old, progress.oldUrl},
+        {&directories.staging, stagingUrl},
+        {&directories.journals, services_.configuration.replaceDirectory().appendingFile("journal")}};
+    constexpr std::size_t ofTheNewOne = 2;
+    for (const auto& [descriptor, url] : std::span(wanted).first(progress.oldRecord ? std::size(wanted) : ofTheNewOne)) {
         const FileURL directory = url.deletingLastPathComponent();
         auto opened = services_.fileManager.resolver().openDirectory(directory);
         if (!opened)
@@ -265,19 +278,10 @@ Result<void> ZORClientConnection::putNewInPlace(const ReplaceRequest& request, R
     const Log& log = services_.log;
     const Here here{replaceFunction, __LINE__};
     ZORMetadata& record = *progress.newRecord;
-    Result<void> moved;
-    if (progress.oldRecord) {
-        const auto renamed = services_.fileManager.moveItem(progress.directories.fresh.get(), progress.newUrl,
-                                                            progress.directories.dest.get(), progress.destUrl);
-        if (!renamed)
-            moved = renamed.error();
-    } else {
-        moved = services_.fileManager.moveItemAtURL(progress.newUrl, progress.destUrl);
-    }
+    const auto moved = services_.fileManager.moveItem(progress.directories.fresh.get(), progress.newUrl,
+                                                      progress.directories.dest.get(), progress.destUrl);
     if (!moved)
-        return makeError(log, here, ErrorCode::newNotMovedIntoPlace, &moved.error(), LogFlag::yes,
-                         "Failed to replace: %s with: %s at: %s", progress.oldUrl.c_str(), progress.newUrl.c_str(),
-                         progress.destUrl.c_str());
+        return notInPlace(progress, moved.error());
     progress.newUuidBefore.reset(); // the old UUID is its own from now on
     const bool newWasTransient = record.transient();
     const auto removed = services_.cache.removeContainerForUser(request.userIdNew, request.classNew,
