@@ -185,7 +185,11 @@ Scenario structure() {
             const bool mended = std::filesystem::is_directory(path + "/Library/Caches");
             return acted && !mended ? "what was acknowledged is missing" : "";
         });
-    scenario.damage = "Library/Caches"; // missing, or made and not yet its owner's
+    // Missing, or made and not yet its owner's.
+    scenario.isDamage = [container](const std::string& complaint) {
+        const std::string name = container->path.substr(container->path.rfind('/') + 1);
+        return complaint.find(name) != std::string::npos && complaint.find("Library/Caches") != std::string::npos;
+    };
     scenario.pointsMin = 3;
     return scenario;
 }

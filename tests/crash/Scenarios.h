@@ -24,11 +24,11 @@ struct Scenario {
     /// Calls for each state that a power cut may leave, at the most: a call that only syncs leaves what the one before
     /// it left, and where few others are made that counts.
     std::size_t callsPerStateMax = 1;
-    /// The damage that the scenario starts from and is there to mend: what a complaint about it names.
-    std::string damage;
+    /// Whether a complaint is about the damage that the scenario starts from and is there to mend.
+    std::function<bool(const std::string& complaint)> isDamage;
     /// `complaint` unless it is about that.
     [[nodiscard]] std::string withoutDamage(const std::string& complaint) const {
-        return !damage.empty() && complaint.find(damage) != std::string::npos ? "" : complaint;
+        return isDamage && isDamage(complaint) ? "" : complaint;
     }
     /// Judges what only this scenario knows of; after a restart. `acted` when act came to its end without an error.
     std::function<std::string(const std::string& root, bool acted)> also;
