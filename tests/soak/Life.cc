@@ -227,7 +227,7 @@ void Life::actOnLive(Item& item, const Known& known) {
         mendStructure(item, known);
         break;
     case 7:
-        protect(item, known);
+        protect(item);
         break;
     case 8:
         question(item, known);
@@ -297,7 +297,7 @@ void Life::mendStructure(const Item& item, const Known& known) {
         found("recreate made no " + data->path + "/tmp");
 }
 
-void Life::protect(const Item& item, const Known& known) {
+void Life::protect(const Item& item) {
     if (item.containerClass == bundleApplication)
         return;
     const bool locked = session_.locked;
@@ -310,7 +310,6 @@ void Life::protect(const Item& item, const Known& known) {
     const bool refused = !changed && changed.error().code == codeLocked && locked;
     if (!changed && !refused && !excused(changed))
         found("protect " + item.identifier + ": " + changed.error().message);
-    (void)known;
 }
 
 void Life::question(const Item& item, const Known& known) {

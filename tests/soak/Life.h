@@ -41,7 +41,7 @@ private:
     void went(Item& item);
     void writeContent(Item& item, const Known& known);
     void mendStructure(const Item& item, const Known& known);
-    void protect(const Item& item, const Known& known);
+    void protect(const Item& item);
     void question(const Item& item, const Known& known);
     void registerGroups();
     void lookAtGroups();
