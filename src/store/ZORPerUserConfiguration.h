@@ -26,7 +26,7 @@ public:
 
     /// The home that the password database names, without links; the database's errno when it names none.
     [[nodiscard]] static std::expected<FileURL, int> homeOf(const platform::PasswordDatabase& passwords,
-                                                       std::uint32_t userId);
+                                                            std::uint32_t userId);
 
     [[nodiscard]] std::uint32_t userId() const { return userId_; }
     /// Looked up once; again where this process had no descriptors or memory left to ask with.

@@ -263,7 +263,8 @@ Result<void> ZORClientConnection::openDirectories(ReplaceProgress& progress, con
         {&directories.staging, stagingUrl},
         {&directories.journals, services_.configuration.replaceDirectory().appendingFile("journal")}};
     constexpr std::size_t ofTheNewOne = 2;
-    for (const auto& [descriptor, url] : std::span(wanted).first(progress.oldRecord ? std::size(wanted) : ofTheNewOne)) {
+    for (const auto& [descriptor, url] :
+         std::span(wanted).first(progress.oldRecord ? std::size(wanted) : ofTheNewOne)) {
         const FileURL directory = url.deletingLastPathComponent();
         auto opened = services_.fileManager.resolver().openDirectory(directory);
         if (!opened)
