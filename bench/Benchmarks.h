@@ -27,6 +27,12 @@ std::vector<Figure> measureClass(const Settings& settings);
 std::vector<Figure> measureProtection(const Settings& settings);
 /// A container with many files is measured and removed: TreeBench.cc.
 std::vector<Figure> measureTree(const Settings& settings);
+/// A container takes another's place, and a bundle tells again what it takes: ReplaceBench.cc.
+std::vector<Figure> measureReplace(const Settings& settings);
+/// Lookups while containers with many files are removed and measured: BusyBench.cc.
+std::vector<Figure> measureBusy(const Settings& settings);
+/// A directory becomes the content of a container: InstallBench.cc.
+std::vector<Figure> measureInstall(const Settings& settings);
 /// The first launch after a boot: BootBench.cc.
 std::vector<Figure> measureBoot(const Settings& settings);
 /// What the daemon costs when nobody asks, and until it answers: LifeBench.cc.

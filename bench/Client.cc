@@ -35,7 +35,7 @@ Frame containerFrame(ipc::Command command, const std::string& identifier, Contai
                      plist::Dictionary rest) {
     rest.set(ipc::keys::command, static_cast<std::uint64_t>(command));
     rest.set(ipc::keys::containerClass, static_cast<std::uint64_t>(containerClass));
-    rest.set(ipc::keys::userId, userId);
+    rest.set(ipc::keys::userId, userOf(containerClass));
     rest.set(ipc::keys::identifier, identifier);
     return requestFrame(rest);
 }

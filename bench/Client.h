@@ -4,6 +4,7 @@
 #pragma once
 
 #include "daemon/base/ContainerClass.h"
+#include "daemon/base/UserIdentity.h"
 #include "ipc/Keys.h"
 #include "platform/FileDescriptor.h"
 #include "plist/Value.h"
@@ -17,8 +18,12 @@ namespace zor::bench {
 
 using Frame = std::vector<std::uint8_t>;
 
-/// The user of all containers here.
+/// The user of all containers here but bundles.
 constexpr std::uint32_t userId = 501;
+/// The user of a class's containers here.
+[[nodiscard]] constexpr std::uint32_t userOf(ContainerClass containerClass) {
+    return isBundleClass(containerClass) ? bundleOwnerUserId : userId;
+}
 
 /// A whole frame of a request.
 [[nodiscard]] Frame requestFrame(const plist::Dictionary& request);

@@ -23,8 +23,6 @@ using platform::FileDescriptor;
 namespace {
 
 constexpr int entriesEach = 100;
-/// One file of so many has content: to write all of them would take most of a run.
-constexpr int filesForOneWithContent = 4;
 constexpr int directoryFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
 constexpr std::size_t bufferBytes = std::size_t{32} << 10;
 
@@ -88,7 +86,7 @@ ContentTree::ContentTree(std::string path, const Shape& shape) : path_(std::move
             lower = makeDirectory(upper.get(), text("%02d", i / entriesEach % entriesEach).c_str());
         const std::string name = text("file-%07d.data", i);
         const FileDescriptor file(::openat(lower.get(), name.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0644));
-        const std::size_t bytes = i % filesForOneWithContent == 0 ? content.size() : 0;
+        const std::size_t bytes = i % shape.contentEvery == 0 ? content.size() : 0;
         if (!file.valid() || ::write(file.get(), content.data(), bytes) != static_cast<ssize_t>(bytes))
             failWithErrno(path_);
     }

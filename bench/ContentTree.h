@@ -13,7 +13,8 @@ class ContentTree {
 public:
     struct Shape {
         int files = 0;
-        std::size_t fileBytes = 0; // of every fourth, the others are empty
+        std::size_t fileBytes = 0;
+        int contentEvery = 1; // one file in so many has content, the others are empty
     };
     /// Makes it at `path`, where nothing is: a hundred files in each directory, a hundred of those in each one above.
     ContentTree(std::string path, const Shape& shape);

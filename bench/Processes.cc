@@ -7,6 +7,7 @@
 #include <csignal>
 #include <cstring>
 #include <ctime>
+#include <fcntl.h>
 #include <sys/prctl.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -68,6 +69,22 @@ std::optional<int> ChildProcess::waitFor(int milliseconds) {
             return std::nullopt;
         ::usleep(500);
     }
+}
+
+double runProgram(const std::vector<std::string>& command) {
+    std::vector<char*> arguments;
+    for (const std::string& word : command)
+        arguments.push_back(const_cast<char*>(word.c_str()));
+    arguments.push_back(nullptr);
+    const auto begin = Clock::now();
+    ChildProcess process([&] {
+        const int nothing = ::open("/dev/null", O_WRONLY | O_CLOEXEC);
+        ::dup2(nothing, STDOUT_FILENO);
+        ::execvp(arguments.front(), arguments.data());
+    });
+    if (process.wait() != 0)
+        throw Failure(command.front() + " failed");
+    return secondsSince(begin);
 }
 
 int measuringProcessor() {

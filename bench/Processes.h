@@ -9,6 +9,7 @@
 #include <stdexcept>
 #include <string>
 #include <sys/types.h>
+#include <vector>
 
 namespace zor::bench {
 
@@ -41,6 +42,9 @@ private:
 
     pid_t pid_ = -1;
 };
+
+/// Runs a program, its output thrown away, and gives the seconds that it took; a failure when it fails.
+double runProgram(const std::vector<std::string>& command);
 
 /// The processor that pinned measurements use: the last one that this process may use.
 [[nodiscard]] int measuringProcessor();

@@ -70,18 +70,6 @@ std::vector<std::string> bareCommand(std::vector<std::string> launcherCommand) {
     return command;
 }
 
-double milliseconds(const std::vector<std::string>& command) {
-    std::vector<char*> arguments;
-    for (const std::string& word : command)
-        arguments.push_back(const_cast<char*>(word.c_str()));
-    arguments.push_back(nullptr);
-    const auto begin = Clock::now();
-    ChildProcess child([&] { ::execv(arguments.front(), arguments.data()); });
-    if (child.wait() != 0)
-        throw Failure(command.front() + " failed");
-    return secondsSince(begin) * 1e3;
-}
-
 } // namespace
 
 std::vector<Figure> measureRun(const Settings& settings) {
@@ -109,8 +97,8 @@ std::vector<Figure> measureRun(const Settings& settings) {
     Pairs pairs;
     const int runs = settings.rounds(100, 30);
     for (int run = -2; run < runs; ++run) {
-        const double measured = milliseconds(command);
-        const double floor = milliseconds(bare);
+        const double measured = runProgram(command) * 1e3;
+        const double floor = runProgram(bare) * 1e3;
         if (run < 0) // warms up, and makes the containers
             continue;
         pairs.measured.push_back(measured);

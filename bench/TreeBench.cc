@@ -4,40 +4,27 @@
 #include "Benchmarks.h"
 #include "ContentTree.h"
 
-#include <fcntl.h>
 #include <filesystem>
-#include <unistd.h>
 
 namespace zor::bench {
 
 namespace {
 
 constexpr ContainerClass containerClass = ContainerClass::dataApplication;
-constexpr std::size_t fileBytes = 1000; // a block each
+/// A block; of one file in four, since to write all of them would take most of a run.
+constexpr std::size_t fileBytes = 1000;
 /// What a new container holds besides its content.
 constexpr std::uint64_t bytesOfContainerMax = std::uint64_t{1} << 20;
 
-/// Runs a program of the system and gives the seconds that it took.
-double run(const std::vector<const char*>& command) {
-    const auto begin = Clock::now();
-    ChildProcess process([&] {
-        const int nothing = ::open("/dev/null", O_WRONLY | O_CLOEXEC);
-        ::dup2(nothing, STDOUT_FILENO);
-        std::vector<char*> arguments;
-        for (const char* word : command)
-            arguments.push_back(const_cast<char*>(word));
-        arguments.push_back(nullptr);
-        ::execvp(arguments.front(), arguments.data());
-    });
-    if (process.wait() != 0)
-        throw Failure(std::string(command.front()) + " failed");
-    return secondsSince(begin);
+Container makeIn(const Daemon& daemon, const std::string& identifier) {
+    Client client = daemon.connect();
+    return makeContainer(client, identifier, containerClass);
 }
 
 struct Filled {
-    Filled(Client& client, const std::string& identifier, int files)
-        : container(makeContainer(client, identifier, containerClass)),
-          tree(container.path + "/Documents/content", {.files = files, .fileBytes = fileBytes}),
+    Filled(const Daemon& daemon, const std::string& identifier, int files)
+        : container(makeIn(daemon, identifier)),
+          tree(container.path + "/Documents/content", {.files = files, .fileBytes = fileBytes, .contentEvery = 4}),
           usageRequest(containerFrame(ipc::Command::getDiskUsage, identifier, containerClass,
                                       {{std::string(ipc::keys::uuid), container.uuid}})) {}
 
@@ -68,14 +55,16 @@ Figure figureOf(const Pairs& pairs, const char* name, std::string what, double g
             .numbers = {{"seconds", pairs.measuredMedian()}, {"floorSeconds", pairs.floorMedian()}}};
 }
 
-std::vector<Figure> measureUsage(const Settings& settings, const Place& place, Client& client, const Filled& filled) {
-    const char* const path = filled.container.path.c_str();
+std::vector<Figure> measureUsage(const Settings& settings, const Place& place, const Daemon& daemon,
+                                 const Filled& filled) {
+    Client client = daemon.connect();
+    const std::string& path = filled.container.path;
     Pairs walk;
     Pairs du;
     for (int round = -1; round < settings.rounds(9, 5); ++round) {
         const ContentTree::Usage floor = filled.tree.measure();
         const double seconds = filled.usageSeconds(client, floor.bytes);
-        const double peer = run({"du", "-s", path});
+        const double peer = runProgram({"du", "-s", path});
         if (round < 0)
             continue;
         walk.measured.push_back(seconds);
@@ -91,8 +80,8 @@ std::vector<Figure> measureUsage(const Settings& settings, const Place& place, C
     for (int round = 0; round < settings.rounds(3, 1) && dropCaches(place.path()); ++round) {
         cold.measured.push_back(filled.usageSeconds(client, bytes));
         dropCaches(place.path());
-        (void)run({"du", "-s", "/dev/null"}); // its own pages are not what is measured
-        cold.floor.push_back(run({"du", "-s", path}));
+        (void)runProgram({"du", "-s", "/dev/null"}); // its own pages are not what is measured
+        cold.floor.push_back(runProgram({"du", "-s", path}));
     }
     figures.push_back(figureOf(cold, "usage.cold", text("usage of %d files, from the disk, against du", files), 1.1));
     if (cold.measured.empty()) {
@@ -123,25 +112,25 @@ std::vector<Figure> measureTree(const Settings& settings) {
     const Place place(*settings.scratch, "tree", {.bytes = std::uint64_t{4} << 30, .inodes = 500'000});
     prepareRoot(settings, place.path());
     const Daemon daemon(settings, place.path(), {});
-    Client client = daemon.connect();
     const auto identifier = [](int round) { return text("com.example.application.tree.%d", round); };
     std::vector<Figure> figures;
     Pairs removal;
     double peer = 0;
     for (int round = 0; round < settings.rounds(1, 3); ++round) {
-        const Filled filled(client, identifier(round), files);
+        const Filled filled(daemon, identifier(round), files);
         if (round == 0)
-            figures = measureUsage(settings, place, client, filled);
-        const ContentTree floor(place.path() + "/floor", {.files = files, .fileBytes = fileBytes});
+            figures = measureUsage(settings, place, daemon, filled);
+        const ContentTree floor(place.path() + "/floor", {.files = files, .fileBytes = fileBytes, .contentEvery = 4});
         writeOut(place.path());
-        removal.measured.push_back(removalSeconds(client, identifier(round), filled.container.path));
+        Client deleting = daemon.connect();
+        removal.measured.push_back(removalSeconds(deleting, identifier(round), filled.container.path));
         writeOut(place.path());
         removal.floor.push_back(floor.remove());
     }
     {
-        const ContentTree tree(place.path() + "/floor", {.files = files, .fileBytes = fileBytes});
+        const ContentTree tree(place.path() + "/floor", {.files = files, .fileBytes = fileBytes, .contentEvery = 4});
         writeOut(place.path());
-        peer = run({"rm", "-rf", tree.path().c_str()});
+        peer = runProgram({"rm", "-rf", tree.path()});
     }
     figures.push_back(figureOf(removal, "removal", text("death-row removal of %d files", files), 1.1,
                                text("rm -rf takes %.0f ms; on ", peer * 1e3) + place.description()));

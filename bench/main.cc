@@ -29,7 +29,8 @@ Measures the daemon beside this program and prints each figure with its goal.
 
   --quick       fewer repetitions and smaller stores; under a minute
   --only NAME   one group: lookup, registration, throughput, upcall, create, class,
-                protection, boot, tree, start, endurance, run
+                protection, boot, tree, replace, busy,
+                install, start, endurance, run
   --json FILE   write the figures to FILE, too
 
 As root it measures on file systems made for the run; others use a directory.
@@ -55,6 +56,9 @@ constexpr Group groups[] = {
     {"protection", measureProtection},
     {"boot", measureBoot},
     {"tree", measureTree},
+    {"replace", measureReplace},
+    {"busy", measureBusy},
+    {"install", measureInstall},
     {"start", measureStart},
     {"endurance", measureEndurance},
     {"run", measureRun},
