@@ -1,10 +1,11 @@
 // SPDX-License-Identifier: Apache-2.0
-// The first launch of a boot over a device that an older system left, with each of its calls failing and the daemon
-// ending at each.
+// The first launch of a boot over a device that an older system left, with each of its calls failing, the daemon ending
+// at each, and the power going after each.
 #include "crash/StoreWorld.h"
 #include "entitlements/ZOREntitlementMapping.h"
 #include "plist/Binary.h"
 #include "support/FaultLoop.h"
+#include "support/PowerCut.h"
 #include "support/ProcessResources.h"
 
 #include <filesystem>
@@ -70,7 +71,7 @@ std::string bytesOf(const files::path& path) {
 }
 
 struct OldDevice {
-    OldDevice(FaultDisk& faultDisk) : disk(faultDisk), device("/dev/shm") {
+    explicit OldDevice(platform::Disk& ofTheBoot) : disk(ofTheBoot), device("/dev/shm") {
         device.marker.make();
         device.start(disk, journalEverywhere);
         const std::string key(entitlementKeys::systemContainer);
@@ -89,7 +90,7 @@ struct OldDevice {
         device.marker.forget();
     }
 
-    FaultDisk& disk;
+    platform::Disk& disk;
     ProcessResources before;
     Device device;
     std::string bundleRecord;
@@ -142,18 +143,15 @@ Bundle expectationAfter(const OldDevice& old, const FaultOutcome& outcome) {
     return done && asItWas && oneError ? Bundle::inPlace : Bundle::known;
 }
 
-std::string judge(OldDevice& old, const FaultOutcome& outcome) {
-    const Bundle expected = expectationAfter(old, outcome);
-    Device& device = old.device;
-    device.daemon.reset();
-    if (std::string leaked = old.before.leakedSince(); !leaked.empty())
-        return "leaked: " + leaked;
+/// Of a boot that finishes the migration, and one that finds nothing to do.
+std::string judgeNextBoots(const std::string& root, Bundle expected) {
     platform::LinuxDisk disk;
+    MemoryBootMarker marker;
     for (const bool isLast : {false, true}) {
-        device.marker.forget();
-        StoreDaemon daemon(device.root.path(), device.marker, disk, journalEverywhere);
+        marker.forget();
+        StoreDaemon daemon(root, marker, disk, journalEverywhere);
         daemon.launch();
-        if (std::string complaint = judgeMigrated(device.root.path(), daemon, expected); !complaint.empty())
+        if (std::string complaint = judgeMigrated(root, daemon, expected); !complaint.empty())
             return "after the next boot: " + complaint + daemon.log();
         // The transient directories, two of the system's and one of the user's, go at each boot.
         constexpr std::uint64_t transientDirectories = 3;
@@ -161,6 +159,15 @@ std::string judge(OldDevice& old, const FaultOutcome& outcome) {
             return "the boot after it found something to do: " + daemon.log();
     }
     return "";
+}
+
+std::string judge(OldDevice& old, const FaultOutcome& outcome) {
+    const Bundle expected = expectationAfter(old, outcome);
+    Device& device = old.device;
+    device.daemon.reset();
+    if (std::string leaked = old.before.leakedSince(); !leaked.empty())
+        return "leaked: " + leaked;
+    return judgeNextBoots(device.root.path(), expected);
 }
 
 // Goal: whatever call of a boot's setup fails, and wherever the daemon ends in it, the next boot brings an older
@@ -180,6 +187,29 @@ TEST(BootFaultTest, TheNextBootFinishesIt) {
                 old->device.daemon->launch();
             },
             [](const std::unique_ptr<OldDevice>& old, const FaultOutcome& outcome) { return judge(*old, outcome); });
+        EXPECT_EQ(report.complaint, "");
+        EXPECT_GT(report.examined, 30U);
+    }
+}
+
+// Goal: the same wherever the power goes in that boot, on a file system that keeps order and on one that keeps none.
+// Method: the boot recorded once; each state that a cut after one of its calls may leave is booted twice.
+TEST(BootPowerCutTest, TheNextBootFinishesIt) {
+    for (const DiskModel model : {DiskModel::orderedJournal, DiskModel::unordered}) {
+        SCOPED_TRACE(model == DiskModel::unordered ? "unordered" : "ordered");
+        platform::LinuxDisk linuxDisk;
+        OldDevice old(linuxDisk);
+        Device& device = old.device;
+        RecordingDisk disk(linuxDisk, device.root.path(), {"run"});
+        disk.start();
+        device.start(disk, model == DiskModel::unordered ? noOrderAnywhere : journalEverywhere);
+        ASSERT_EQ(judgeMigrated(device.root.path(), *device.daemon, Bundle::known), "");
+        device.daemon.reset();
+        ASSERT_EQ(disk.complaint(), "");
+        const LoopReport report =
+            forEachPowerCut(disk.log(), {.model = model}, [](const PowerCutState&, const std::string& root) {
+                return judgeNextBoots(root, Bundle::known);
+            });
         EXPECT_EQ(report.complaint, "");
         EXPECT_GT(report.examined, 30U);
     }
