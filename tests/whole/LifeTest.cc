@@ -4,6 +4,7 @@
 
 #include <atomic>
 #include <filesystem>
+#include <future>
 #include <gtest/gtest.h>
 #include <random>
 #include <set>
@@ -229,6 +230,43 @@ TEST(Tool, ExitCodesAndOutput) {
     };
     for (const ToolCall& row : rows)
         expectCall(root, row);
+}
+
+// Goal: a change of protection class that waits for an unlock ends with the daemon: its client hears so, nothing of it
+// is recorded or on disk, and asking again works. Method: a locked device, SIGKILL once the change is said to wait.
+TEST(Life, KilledWhileAChangeOfProtectionWaits) {
+    DaemonProcess daemon;
+    daemon.start();
+    const std::string root = daemon.root();
+    const std::vector<std::string> show = {"--json", "protection", "a.b", "--class", "2"};
+    expectCall(root, {{"create", "a.b", "--class", "2"}, 0, "created"});
+    expectCall(root, {{"protect", "a.b", "3", "--class", "2", "--third-party"}, 0, "has class 3"});
+    expectCall(root, {{"lock-state", "1"}, 0, "locked"});
+    auto waiting = std::async(std::launch::async, [&daemon] {
+        return daemon.client().setDataProtection({.containerClass = dataApplication,
+                                                  .user = 501,
+                                                  .identifier = "a.b",
+                                                  .protectionClass = 1,
+                                                  .thirdParty = true,
+                                                  .retryIfLocked = true});
+    });
+    std::vector<std::string> words = {programPath("zorvanectl"), "--root", root};
+    words.insert(words.end(), show.begin(), show.end());
+    bool waits = false;
+    for (int tries = 0; tries < 200 && !waits; ++tries)
+        waits = runProgram(words).output.find("\"waitsForUnlock\": true") != std::string::npos;
+    ASSERT_TRUE(waits);
+    daemon.kill();
+    const auto answer = waiting.get();
+    ASSERT_FALSE(answer);
+    EXPECT_EQ(answer.error().kind, zorvane::Error::Kind::refused) << answer.error().message;
+    daemon.start();
+    expectCall(root, {show, 0, "\"pending\": null"});
+    expectCall(root, {show, 0, "\"recorded\": 3"});
+    expectCall(root, {{"lock-state", "0"}, 0, "unlocked"});
+    expectCall(root, {show, 0, "\"recorded\": 3"});
+    expectCall(root, {{"protect", "a.b", "1", "--class", "2", "--third-party"}, 0, "has class 1"});
+    expectCall(root, {show, 0, "\"recorded\": 1"});
 }
 
 // Goal: damage is found, told and mended as promised, with a daemon and without one. Method: a table of calls over a

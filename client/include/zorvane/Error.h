@@ -10,9 +10,10 @@ namespace zorvane {
 
 struct Error {
     enum class Kind {
-        /// The daemon cannot be reached: not running, another root, no permission, or it stopped meanwhile.
+        /// The daemon cannot be reached: not running, another root, no permission, or it stopped before the call.
         unreachable,
-        /// The daemon ended the connection instead of answering: this program may not send the command.
+        /// The daemon ended the connection instead of answering: this program may not send the command, or the daemon
+        /// stopped while the call waited.
         refused,
         /// The time given to the call ran out. The command may still be carried out.
         timedOut,
