@@ -27,21 +27,30 @@ target_include_directories(zor_options INTERFACE ${CMAKE_SOURCE_DIR}/src)
 set(CMAKE_POSITION_INDEPENDENT_CODE OFF)
 target_compile_options(zor_options INTERFACE -fPIC)
 
-# Half of a translation unit's time went into the standard library's headers. Every source still includes what it uses: clang-tidy
-# looks at all of them without.
-option(ZORVANE_PCH "Precompile the standard headers" ON)
-if(ZORVANE_PCH)
-    file(CONFIGURE OUTPUT ${CMAKE_BINARY_DIR}/pch.cc CONTENT "")
-    add_library(zor_pch STATIC ${CMAKE_BINARY_DIR}/pch.cc)
-    target_link_libraries(zor_pch PRIVATE zor_options)
-    target_precompile_headers(zor_pch PRIVATE <algorithm> <atomic> <condition_variable> <deque> <expected> <functional>
-        <map> <memory> <mutex> <optional> <set> <span> <string> <string_view> <thread> <unordered_set> <variant> <vector>)
-endif()
-function(zor_use_pch target)
+# Half of a translation unit's time went into the headers of libraries. What is installed still includes what it uses: clang-tidy
+# looks at it without.
+# zor_precompile(name LINK ... HEADERS ...): the standard headers and these, for the targets of this folder from here on.
+option(ZORVANE_PCH "Precompile the headers of libraries" ON)
+macro(zor_precompile name)
+    cmake_parse_arguments(ARG "" "" "LINK;HEADERS" ${ARGN})
     if(ZORVANE_PCH)
-        target_precompile_headers(${target} REUSE_FROM zor_pch)
+        file(CONFIGURE OUTPUT ${CMAKE_BINARY_DIR}/pch.cc CONTENT "")
+        add_library(${name} STATIC ${CMAKE_BINARY_DIR}/pch.cc)
+        target_link_libraries(${name} PRIVATE zor_options ${ARG_LINK})
+        target_precompile_headers(${name} PRIVATE <algorithm> <atomic> <condition_variable> <deque> <expected> <functional>
+            <map> <memory> <mutex> <optional> <set> <span> <string> <string_view> <thread> <unordered_set> <variant>
+            <vector> ${ARG_HEADERS})
+        set(ZORVANE_PRECOMPILED ${name})
+    endif()
+endmacro()
+function(zor_use_pch target)
+    if(ZORVANE_PRECOMPILED)
+        target_precompile_headers(${target} REUSE_FROM ${ZORVANE_PRECOMPILED})
     endif()
 endfunction()
+if(NOT ZORVANE_TIDY)
+    zor_precompile(zor_pch)
+endif()
 
 # zor_library(name DIR folders... [EXCLUDE files...] LINK ... [INCLUDE folders...]): the sources of these folders, as zor_<name>.
 function(zor_library name)
