@@ -6,12 +6,16 @@
 
 #include <chrono>
 #include <csignal>
+#include <cstdlib>
 #include <fcntl.h>
 #include <filesystem>
 #include <fstream>
 #include <functional>
 #include <gtest/gtest.h>
+#include <set>
 #include <sys/mount.h>
+#include <sys/ptrace.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <thread>
 #include <unistd.h>
@@ -80,6 +84,72 @@ public:
 private:
     pid_t pid_ = -1;
     platform::FileDescriptor output_;
+};
+
+/// An installer whose system calls are looked at.
+class TracedInstaller {
+public:
+    TracedInstaller(const DaemonProcess& daemon, const std::string& source) : pid_(::fork()) {
+        if (pid_ == 0) {
+            const platform::FileDescriptor nothing(::open("/dev/null", O_WRONLY | O_CLOEXEC));
+            ::dup2(nothing.get(), 1);
+            ::dup2(nothing.get(), 2);
+            ::setenv("ASAN_OPTIONS", "detect_leaks=0", 1); // it would trace, too
+            if (::ptrace(PTRACE_TRACEME, 0, nullptr, nullptr) != 0)
+                ::_exit(0);
+            const std::string program = programPath("zorvanectl");
+            ::execl(program.c_str(), "zorvanectl", "--root", daemon.root().c_str(), "install", identifier,
+                    source.c_str(), "--class", "1", "--yes", static_cast<char*>(nullptr));
+            ::_exit(127);
+        }
+        stopped_ = next();
+        if (stopped_)
+            ::ptrace(PTRACE_SETOPTIONS, pid_, nullptr, PTRACE_O_EXITKILL | PTRACE_O_TRACESYSGOOD);
+    }
+    ~TracedInstaller() { end(); }
+    TracedInstaller(const TracedInstaller&) = delete;
+    TracedInstaller& operator=(const TracedInstaller&) = delete;
+    [[nodiscard]] bool isTraced() const { return stopped_; }
+    /// Before the change with this number is made, from 0; false when there are not so many.
+    bool killedAtChange(std::size_t number) {
+        for (int signal = 0; stopped_;) {
+            ::ptrace(PTRACE_SYSCALL, pid_, nullptr, signal);
+            stopped_ = next();
+            signal = stopped_ && WSTOPSIG(status_) != (SIGTRAP | 0x80) ? WSTOPSIG(status_) : 0;
+            if (!stopped_ || signal != 0 || !changesSomething())
+                continue;
+            if (number-- == 0) {
+                end();
+                return true;
+            }
+        }
+        return false;
+    }
+
+private:
+    void end() {
+        if (stopped_)
+            ::kill(pid_, SIGKILL);
+        while (stopped_)
+            stopped_ = next();
+    }
+    bool next() { return ::waitpid(pid_, &status_, 0) == pid_ && WIFSTOPPED(status_); }
+    [[nodiscard]] bool changesSomething() const {
+        static const std::set<std::uint64_t> changes = {
+            SYS_openat,    SYS_openat2,         SYS_mkdirat,   SYS_renameat,  SYS_renameat2, SYS_unlinkat,
+            SYS_symlinkat, SYS_linkat,          SYS_fchmod,    SYS_fchmodat,  SYS_fchown,    SYS_fchownat,
+            SYS_write,     SYS_pwrite64,        SYS_fsetxattr, SYS_ftruncate, SYS_fsync,     SYS_fdatasync,
+            SYS_syncfs,    SYS_copy_file_range, SYS_utimensat, SYS_sendmsg,   SYS_sendto,    SYS_ioctl};
+        __ptrace_syscall_info info{};
+        return ::ptrace(PTRACE_GET_SYSCALL_INFO, pid_, sizeof info, &info) > 0 &&
+               info.op == PTRACE_SYSCALL_INFO_ENTRY && changes.contains(info.entry.nr) && !onlyReads(info);
+    }
+    [[nodiscard]] static bool onlyReads(const __ptrace_syscall_info& info) {
+        return info.entry.nr == SYS_openat && (info.entry.args[2] & O_CREAT) == 0;
+    }
+    const pid_t pid_;
+    int status_ = 0;
+    bool stopped_ = false;
 };
 
 std::string pathOf(const DaemonProcess& daemon, std::uint64_t containerClass, bool transient = false) {
@@ -243,6 +313,48 @@ TEST(Install, WhateverFailsTheOldOneStays) {
         EXPECT_EQ(again.wait(), 0) << again.said;
         EXPECT_TRUE(std::filesystem::exists(pathOf(daemon, bundleApplication) + "/folder79/file7999"));
     }
+}
+
+// Goal: wherever the installer ends, the old container or the new one is there whole, and what it left goes at the next
+// boot. Method: SIGKILL at the first, second, ... system call by which it changes anything outside itself, until it
+// meets none; both contents take turns.
+TEST(Install, KilledAtEachOfItsChanges) {
+    const support::TemporaryDirectory place;
+    std::string sources[2];
+    std::string contents[2];
+    DaemonProcess daemon;
+    daemon.start();
+    for (const int version : {0, 1}) {
+        sources[version] = place.path() + "/" + std::to_string(version);
+        std::vector<zor::test::Made> entries;
+        for (const int number : {1, 2, 3})
+            entries.push_back(file("folder/f" + std::to_string(number), std::to_string(version)));
+        writeFile(sources[version], makeArchive(Form::tar, entries));
+        Installer whole(daemon, sources[version]);
+        ASSERT_EQ(whole.wait(), 0) << whole.said;
+        contents[version] = contentOf(pathOf(daemon, bundleApplication));
+    }
+    int current = 1;
+    std::size_t point = 0;
+    for (bool ended = false; !ended; ++point) {
+        SCOPED_TRACE(point);
+        TracedInstaller installer(daemon, sources[1 - current]);
+        if (!installer.isTraced())
+            GTEST_SKIP() << "skipped: processes may not be traced here";
+        ended = !installer.killedAtChange(point);
+        const std::string content = contentOf(pathOf(daemon, bundleApplication));
+        if (content == contents[1 - current])
+            current = 1 - current;
+        else
+            ASSERT_EQ(content, contents[current]);
+        daemon.kill();
+        daemon.start({"--forget-boot"});
+        EXPECT_TRUE(isGone(daemon));
+        EXPECT_EQ(contentOf(pathOf(daemon, bundleApplication)), contents[current]);
+        const auto checked = runProgram({programPath("zorvanectl"), "--root", daemon.root(), "check"});
+        EXPECT_EQ(checked.exitStatus, 0) << checked.output;
+    }
+    EXPECT_GT(point, 30U);
 }
 
 // Goal: content that is whole is not thrown away when the old one is not there any more. Method: it is deleted while
