@@ -241,8 +241,9 @@ private:
 
     void runDeletionPass(const std::function<void(ErrorCode)>& completion);
     std::optional<ZORError> deleteEverythingOnDeathRow();
-    /// `classDirectory` is open and holds the entry.
-    bool isOrphan(int classDirectory, const FileURL& entry, ContainerClass containerClass);
+    enum class Orphan : std::uint8_t { no, byName, noMetadata };
+    /// `classDirectory` is open and holds the entry. Several threads may ask at once.
+    Orphan orphanKind(int classDirectory, const FileURL& entry, ContainerClass containerClass);
     void reportOrphan(const FileURL& entry);
     // Passes of the setup; each gives the number of items it changed.
     std::uint64_t migrateBundles();

@@ -9,6 +9,7 @@
 #include "entitlements/ZOREntitlementMapping.h"
 #include "entitlements/ZORGroupManager.h"
 #include "entitlements/ZORWhitelist.h"
+#include "fs/Stretches.h"
 #include "migration/ZORContainerMigrator.h"
 #include "store/Names.h"
 #include "store/StoreServices.h"
@@ -17,6 +18,7 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
+#include <vector>
 
 namespace zor {
 
@@ -113,20 +115,18 @@ std::uint64_t ZORClientConnection::cleanUpUsers() {
     return removed;
 }
 
-bool ZORClientConnection::isOrphan(int classDirectory, const FileURL& entry, ContainerClass containerClass) {
+ZORClientConnection::Orphan ZORClientConnection::orphanKind(int classDirectory, const FileURL& entry,
+                                                            ContainerClass containerClass) {
     const std::string_view name = entry.lastPathComponent();
     // An identifier of the table whose container goes by another name is a name all the same: what lies there is not
     // ours to judge by a table that may have changed.
     const bool acceptable = UUID::parse(name) || services_.whitelist.containerIdIsWellknown(name, containerClass) ||
                             services_.whitelist.directoryNameIsWellknown(name, containerClass);
     if (!acceptable)
-        return true;
+        return Orphan::byName;
     const std::string metadata = std::string(name) + "/" + names::metadataFile;
-    if (!services_.fileManager.itemDoesNotExistBelow(classDirectory, metadata.c_str(), entry))
-        return false;
-    services_.log.write(logLevelError, "_cleanupOrphanedDataForUser",
-                        "Deleting orphaned data missing a metadata file at: %s", entry.c_str());
-    return true;
+    return services_.fileManager.itemDoesNotExistBelow(classDirectory, metadata.c_str(), entry) ? Orphan::noMetadata
+                                                                                                : Orphan::no;
 }
 
 void ZORClientConnection::reportOrphan(const FileURL& entry) {
@@ -154,10 +154,19 @@ std::uint64_t ZORClientConnection::_cleanupOrphanedDataForUser(std::uint32_t use
                             errorText(opened.error()));
         return 0;
     }
+    std::vector<Orphan> kinds(entries->size());
+    fs::forEachStretch(kinds.size(), [&](std::size_t begin, std::size_t end) {
+        for (std::size_t i = begin; i < end; ++i)
+            kinds[i] = orphanKind(opened->get(), (*entries)[i], containerClass);
+    });
     std::uint64_t removed = 0;
-    for (const FileURL& entry : *entries) {
-        if (!isOrphan(opened->get(), entry, containerClass))
+    for (std::size_t i = 0; i < kinds.size(); ++i) {
+        const FileURL& entry = (*entries)[i];
+        if (kinds[i] == Orphan::no)
             continue;
+        if (kinds[i] == Orphan::noMetadata)
+            services_.log.write(logLevelError, __func__, "Deleting orphaned data missing a metadata file at: %s",
+                                entry.c_str());
         if (services_.internalBuild.isInternalBuild())
             reportOrphan(entry);
         // A failure has been logged where it happened; the next boot tries again.
