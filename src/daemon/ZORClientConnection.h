@@ -100,7 +100,7 @@ public:
     };
     /// Takes the containers out of the store; their files go with the next deletion pass. What is not there is skipped,
     /// what is malformed is logged and skipped. With locking it runs under the all-identifiers lock held for writing;
-    /// without, the caller holds it. Errors 11 (lists that do not agree), 46, 40.
+    /// without, the caller holds it. Errors 11 (lists that do not agree), 28 (not durable), 46, 40.
     Result<void> stageForDeleteContainersWithUsers(const DeletionBatch& batch, UseLocking useLocking);
     /// Stages the one container of an identifier. Errors as the lookup's and the staging's.
     Result<void> deleteContainerForUser(std::uint32_t userId, const std::string* identifier,
@@ -207,6 +207,8 @@ private:
 
     /// One element; `changed` gets the directories to be synced.
     Result<void> stageForDelete(const DeletionBatch& batch, std::size_t index, std::vector<FileURL>& changed);
+    /// Error, not logged, when the container still lies in its place.
+    Result<void> moveAwayForDelete(const FileURL& container, const FileURL& destination);
     /// False, logged, when the container stays where it is.
     bool takeAwayForDelete(const FileURL& container, std::vector<FileURL>& changed);
     /// The standard subdirectories of the container that `changed` begins with; each is added to it.
@@ -251,8 +253,8 @@ private:
     std::uint64_t discardAtBoot(const std::optional<FileURL>& url, const char* what);
     std::uint64_t cleanUpUsers();
     std::uint64_t sweepStaging();
-    /// Names in staging that journals on the disk still speak of.
-    std::set<std::string, std::less<>> stagedByJournals();
+    /// Names in staging that journals on the disk still speak of; nullopt when it cannot be told which there are.
+    std::optional<std::set<std::string, std::less<>>> stagedByJournals();
     std::size_t journalCount();
     void makeDirectoriesDurable();
 

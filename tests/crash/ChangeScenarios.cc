@@ -133,28 +133,54 @@ Scenario replacement(const std::string& name, OldOne kind) {
         [both, kind](const std::string& root, bool acted) { return judgeReplacement(root, acted, *both, kind); });
 }
 
+/// The old container waits in staging, the new one is where it was made, and their journal is on the disk.
+struct StoppedReplace {
+    FileURL newUrl;
+    FileURL destUrl;
+};
+StoppedReplace stopAfterFirstMove(Device& device) {
+    const Acknowledged old = makeWithContent(device, false, "old");
+    const Acknowledged fresh = makeWithContent(device, true, "new");
+    const UUID uuid = UUID::random();
+    StoreServices& services = device.daemon->composition().store();
+    const FileURL oldUrl = FileURL::directory(old.path);
+    const ReplaceJournal journal{.oldUrl = oldUrl,
+                                 .newUrl = FileURL::directory(fresh.path),
+                                 .stagingUrl =
+                                     services.configuration.stagingDirectory().appendingDirectory(uuid.string()),
+                                 .destUrl = oldUrl.deletingLastPathComponent().appendingDirectory(nameOf(fresh.path))};
+    const auto written = journal._writeToDiskReplaceAt(
+        services.log, services.fileManager, ReplaceJournal::urlFor(services.configuration.replaceDirectory(), uuid));
+    if (!written || !services.fileManager.moveItemAtURL(oldUrl, journal.stagingUrl) ||
+        device.disk->syncFileSystem(openBelow(journal.stagingUrl.path()).get()) != 0)
+        throw std::runtime_error("no stopped replace");
+    return {.newUrl = journal.newUrl, .destUrl = journal.destUrl};
+}
+
 /// A launch that finds a replace whose first move was made. Whatever stops it, a later one puts the old one back.
 Scenario recovery() {
-    const auto old = std::make_shared<Acknowledged>();
     return changing(
-        "recovery of a replace",
-        [old](Device& device) {
-            *old = makeWithContent(device, false, "old");
-            const UUID journal = UUID::random();
-            StoreServices& services = device.daemon->composition().store();
-            const FileURL waiting = services.configuration.stagingDirectory().appendingDirectory(journal.string());
-            const FileURL oldUrl = FileURL::directory(old->path);
-            const auto written =
-                ReplaceJournal{.oldUrl = oldUrl, .newUrl = oldUrl, .stagingUrl = waiting, .destUrl = oldUrl}
-                    ._writeToDiskReplaceAt(services.log, services.fileManager,
-                                           ReplaceJournal::urlFor(services.configuration.replaceDirectory(), journal));
-            if (!written || !services.fileManager.moveItemAtURL(oldUrl, waiting))
-                throw std::runtime_error("no stopped replace");
-        },
+        "recovery of a replace", [](Device& device) { stopAfterFirstMove(device); },
         [](Device& device) { device.daemon->launch(); },
-        [old](const std::string& root, bool) -> std::string {
+        [](const std::string& root, bool) -> std::string {
             const Changed now = look(root);
-            return now.content == "old" && now.name == nameOf(old->path) ? "" : "the content is " + now.content;
+            return now.content == "old" ? "" : "the content is " + now.content;
+        });
+}
+
+/// A launch that finds both moves made, the second by a daemon that was killed before it synced it. Where the power
+/// undoes that move, the old one must not be on death row without a journal.
+Scenario recoveryOfADoneReplace() {
+    const auto stopped = std::make_shared<StoppedReplace>();
+    return changing(
+        "recovery of a replace that was done", [stopped](Device& device) { *stopped = stopAfterFirstMove(device); },
+        [stopped](Device& device) {
+            if (device.daemon->composition().store().fileManager.moveItemAtURL(stopped->newUrl, stopped->destUrl))
+                device.daemon->launch();
+        },
+        [](const std::string& root, bool) -> std::string {
+            const Changed now = look(root);
+            return now.content == "old" || now.content == "new" ? "" : "the content is " + now.content;
         });
 }
 
@@ -281,6 +307,7 @@ std::vector<Scenario> changeScenarios() {
             replacement("replace that keeps the UUID", OldOne::replacedAndUuidKept),
             replacement("replace of nothing", OldOne::none),
             recovery(),
+            recoveryOfADoneReplace(),
             wiping(),
             structure(),
             infoValue(),
@@ -288,7 +315,7 @@ std::vector<Scenario> changeScenarios() {
 }
 
 std::vector<Scenario> changeScenariosAtHome() {
-    return {replacement("replace", OldOne::replaced), recovery()};
+    return {replacement("replace", OldOne::replaced), recovery(), recoveryOfADoneReplace()};
 }
 
 } // namespace zor::support

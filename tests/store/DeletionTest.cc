@@ -5,9 +5,11 @@
 #include "world/World.h"
 
 #include <algorithm>
+#include <atomic>
 #include <future>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <thread>
 #include <unistd.h>
 
 namespace zor::test {
@@ -343,6 +345,30 @@ TEST_F(Deletion, OwnersWhoSwapContainers) {
             world.restart();
             world.load();
         }
+}
+
+// Goal: what its owner puts in the place of a container that has just gone is none of the deletion's business. Method:
+// a tree of the owner's waits to take the place the moment it is free.
+TEST_F(Deletion, TheOwnersNextTreeIsLeftAlone) {
+    int taken = 0;
+    for (int round = 0; round < 200; ++round) {
+        const FoundContainer container = make("raced");
+        const std::string tree = container.path + "-next";
+        ASSERT_EQ(::mkdir(tree.c_str(), 0755), 0);
+        std::atomic<bool> moved = false;
+        std::atomic<bool> done = false;
+        std::thread owner([&] {
+            while (!done && !moved)
+                moved = ::rename(tree.c_str(), container.path.c_str()) == 0;
+        });
+        const auto staged = stageBatch(one(container));
+        done = true;
+        owner.join();
+        EXPECT_TRUE(staged);
+        EXPECT_EQ(::rmdir((moved ? container.path : tree).c_str()), 0);
+        taken += moved ? 1 : 0;
+    }
+    EXPECT_GT(taken, 0);
 }
 
 } // namespace

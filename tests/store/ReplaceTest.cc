@@ -256,10 +256,12 @@ TEST_F(Replace, AnExceptionAnywhereIsAnError) {
             EXPECT_TRUE(replaced.error().is(ErrorCode::exceptionCaught)) << replaced.error().text();
         }
         EXPECT_EQ(world.services().locks().identifiersInUse(), 0U);
+        const bool wasThere = find(identifier).has_value();
         world.restart();
         world.daemonsClient().containerManagerSetup();
         world.drainDeathRow();
         const auto found = find(identifier);
+        EXPECT_EQ(found.has_value(), wasThere);
         const bool freshWaits =
             world.services().cache().containerForUser(mobile, application, &identifier, true).has_value();
         EXPECT_TRUE(found || freshWaits);

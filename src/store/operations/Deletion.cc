@@ -109,10 +109,8 @@ Result<void> ZORClientConnection::stageForDelete(const DeletionBatch& batch, std
 bool ZORClientConnection::takeAwayForDelete(const FileURL& container, std::vector<FileURL>& changed) {
     const FileURL deathRow = services_.configuration.deathrowDirectory();
     const FileURL destination = deathRow.appendingDirectory(container.lastPathComponent());
-    const auto moved = services_.fileManager.moveItemAtURL(container, destination);
-    // A move to another file system is a copy, and does not fail when only the source cannot go: it would be found
-    // again.
-    if (moved && !services_.fileManager.itemExistsAtURL(container)) {
+    const auto moved = moveAwayForDelete(container, destination);
+    if (moved) {
         changed.push_back(deathRow);
         return true;
     }
@@ -137,6 +135,23 @@ bool ZORClientConnection::takeAwayForDelete(const FileURL& container, std::vecto
     }
     changed.push_back(container.deletingLastPathComponent());
     return true;
+}
+
+Result<void> ZORClientConnection::moveAwayForDelete(const FileURL& container, const FileURL& destination) {
+    ZORFileManager& fileManager = services_.fileManager;
+    const auto from = fileManager.resolver().openParent(container);
+    const auto to = fileManager.resolver().openParent(destination);
+    if (!from || !to) {
+        const int number = from ? to.error() : from.error();
+        return posixError(ZOR_HERE, number, "open of %s failed: %s", (from ? destination : container).c_str(),
+                          errorText(number));
+    }
+    const auto moved = TRY(fileManager.moveItem(from->directory.get(), container, to->directory.get(), destination));
+    // A copy does not fail when only the source cannot go: it would be found again. After a move by name, what lies
+    // there is the owner's next tree, and none of ours.
+    if (moved == ZORFileManager::Moved::byCopy && fileManager.itemExistsAtURL(container))
+        return posixError(ZOR_HERE, EBUSY, "%s is still there", container.c_str());
+    return {};
 }
 
 std::optional<ZORError> ZORClientConnection::syncDirectories(std::vector<FileURL> changed) {

@@ -186,13 +186,14 @@ Result<void> ZORClientConnection::prepareReplace(const ReplaceRequest& request, 
 
 Result<void> ZORClientConnection::refuseSecondOfIdentifier(const ReplaceProgress& progress) {
     const ZORMetadata& record = *progress.newRecord;
-    const bool sameIdentifier = progress.oldRecord && progress.oldRecord->identifier() == record.identifier();
+    if (progress.oldRecord && progress.oldRecord->identifier() == record.identifier())
+        return {};
     const auto live = services_.cache.containerForUser(record.uid(), record.containerClass(), &record.identifier(),
                                                        progress.oldWasTransient);
     if (!live && !live.error().is(ErrorCode::notFound))
-        return progress.oldRecord ? Result<void>() : Result<void>(live.error());
-    // With an old one, the one that is found may be the old or the new one itself.
-    if (!live || sameIdentifier || (progress.oldRecord && *live == progress.newRecord))
+        return live.error();
+    // With an old one, the one that is found may be the new one itself.
+    if (!live || (progress.oldRecord && *live == progress.newRecord))
         return {};
     return makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::alreadyExists, nullptr, LogFlag::yes,
                      "Container with identifier: %s, class: %ld, transient: %d already exists",
@@ -328,8 +329,12 @@ void ZORClientConnection::recoverFromException(const ReplaceProgress& progress) 
         services_.log.write(logLevelDebug, replaceFunction, "Recovering from exception by moving: %s to %s",
                             progress.stagingUrl.c_str(), progress.oldUrl.c_str());
     const auto moved = fileManager.moveItemAtURL(progress.stagingUrl, progress.oldUrl);
-    if (moved)
+    if (moved) {
+        // Its record may have left the cache already. Should that fail, the next reading of its class finds it.
+        (void)services_.cache.addContainerMetadata(progress.oldRecord, progress.oldRecord->uid(),
+                                                   ContainerPlace(progress.oldUrl), progress.oldWasTransient);
         return;
+    }
     makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::journalUnusable, &moved.error(), LogFlag::yes,
               "Failed to recover replace move: %s to %s", progress.stagingUrl.c_str(), progress.oldUrl.c_str());
     // The journal stays, and the next launch tries again: going on would let the clean-up take the old container.

@@ -14,6 +14,8 @@ constexpr std::string_view newKey = "ZORReplaceOperationNewURL";
 constexpr std::string_view stagingKey = "ZORReplaceOperationStagingURL";
 constexpr std::string_view destKey = "ZORReplaceOperationDestURL";
 
+constexpr std::string_view fileSuffix = ".plist";
+
 /// Four paths; each may have 4,096 bytes.
 constexpr std::size_t journalBytesMax = std::size_t{64} << 10;
 
@@ -24,7 +26,14 @@ std::string shownOf(const plist::Dictionary& content, std::string_view key) {
 } // namespace
 
 FileURL ReplaceJournal::urlFor(const FileURL& replaceDirectory, const UUID& uuid) {
-    return replaceDirectory.appendingFile(uuid.string() + ".plist");
+    return replaceDirectory.appendingFile(uuid.string() + std::string(fileSuffix));
+}
+
+std::string_view ReplaceJournal::stagingNameFor(const FileURL& url) {
+    std::string_view name = url.lastPathComponent();
+    if (name.ends_with(fileSuffix))
+        name.remove_suffix(fileSuffix.size());
+    return name;
 }
 
 Result<void> ReplaceJournal::_writeToDiskReplaceAt(const Log& log, ZORFileManager& fileManager,

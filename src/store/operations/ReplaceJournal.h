@@ -20,6 +20,8 @@ struct ReplaceJournal {
 
     /// "UUID.plist" in the Replace directory.
     [[nodiscard]] static FileURL urlFor(const FileURL& replaceDirectory, const UUID& uuid);
+    /// The name in staging of the old container of the journal at `url`, which need not be readable.
+    [[nodiscard]] static std::string_view stagingNameFor(const FileURL& url);
 
     /// Writes it durably, or nothing. Error 33 when an URL is missing, 34.
     [[nodiscard]] Result<void> _writeToDiskReplaceAt(const Log& log, ZORFileManager& fileManager,

@@ -2,8 +2,9 @@
 // What a launch makes of the replaces that were under way when the last daemon ended.
 //
 // A journal says where the directories of a replace were and were to go; which of them are there says how far it came.
-// `states` is the table of that. Each row's recovery is one move at the most, on the disk before the journal can be
-// gone: a stop in between leaves another row of the table.
+// `states` is the table of that. Each row's recovery is one move at the most. What its state rests on, that move or one
+// which the ended daemon made and had not synced, is on the disk before the journal can be gone: a stop in between
+// leaves another row of the table.
 //
 // Runs on the thread that starts the daemon, before any client and before anything is cached.
 #include "daemon/ZORClientConnection.h"
@@ -31,15 +32,23 @@ struct State {
     Expected destination;
     Expected staging;
     Recovery recovery;
+    /// Where the last move led; nullptr: nothing lies anywhere.
+    const FileURL ReplaceJournal::* settled;
+    int logLevel;
 };
 /// The first row that matches holds. Where the new one is to take the old one's very place, that place counts as the
 /// destination.
 constexpr State states[] = {
-    {"nothing had moved", Expected::present, Expected::anything, Expected::anything, Recovery::nothing},
-    {"nothing was waiting any more", Expected::anything, Expected::present, Expected::absent, Recovery::nothing},
-    {"both had moved", Expected::anything, Expected::present, Expected::anything, Recovery::nothing},
-    {"nothing is left", Expected::absent, Expected::absent, Expected::absent, Recovery::nothing},
-    {"the old one had moved", Expected::absent, Expected::absent, Expected::anything, Recovery::moveOldBack},
+    {"nothing had moved", Expected::present, Expected::anything, Expected::anything, Recovery::nothing,
+     &ReplaceJournal::oldUrl, logLevelNotice},
+    {"nothing was waiting any more", Expected::anything, Expected::present, Expected::absent, Recovery::nothing,
+     &ReplaceJournal::destUrl, logLevelNotice},
+    {"both had moved", Expected::anything, Expected::present, Expected::anything, Recovery::nothing,
+     &ReplaceJournal::destUrl, logLevelNotice},
+    {"nothing is left", Expected::absent, Expected::absent, Expected::absent, Recovery::nothing, nullptr,
+     logLevelError},
+    {"the old one had moved", Expected::absent, Expected::absent, Expected::anything, Recovery::moveOldBack,
+     &ReplaceJournal::oldUrl, logLevelNotice},
 };
 
 bool matches(Expected expected, Found found) {
@@ -58,6 +67,11 @@ Found look(ZORFileManager& fileManager, const FileURL& url) {
     if (fileManager.itemExistsAtURL(url))
         return Found::present;
     return fileManager.itemDoesNotExistAtURL(url) ? Found::absent : Found::unknown;
+}
+
+/// A journal that could not be read may be a good one: it waits for a launch that can read it.
+bool saysNothingOfContent(const ZORError& readFailure) {
+    return readFailure.isOwnShortage() || readFailure.isPosix(EIO);
 }
 
 /// nullptr when what matters cannot be examined.
@@ -100,6 +114,8 @@ Result<void> ZORClientConnection::recoverReplace(const FileURL& journalUrl) {
             log.write(logLevelDebug, recoverFunction, "Doing a replace of %s with info: %s", journalUrl.c_str(),
                       journal->text().c_str());
         TRY(applyReplaceJournal(*journal));
+    } else if (const ZORError* cause = journal.error().underlying(); cause && saysNothingOfContent(*cause)) {
+        return journal.error();
     }
     if (const auto moved = _moveItemAtURLToDeathRow(journalUrl, StartDeletionThread::no); !moved)
         return makeError(log, {recoverFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
@@ -118,15 +134,19 @@ Result<void> ZORClientConnection::applyReplaceJournal(const ReplaceJournal& jour
     const State* const state = stateOf(services_.fileManager, journal);
     if (!state)
         return failed(nullptr);
-    log.write(logLevelNotice, recoverFunction, "A replace of %s had stopped: %s", journal.oldUrl.c_str(), state->label);
-    if (state->recovery == Recovery::nothing)
+    log.write(state->logLevel, recoverFunction, "A replace of %s had stopped: %s", journal.oldUrl.c_str(),
+              state->label);
+    if (state->recovery == Recovery::moveOldBack) {
+        if (log.writes(logLevelDebug))
+            log.write(logLevelDebug, recoverFunction, "Recovering from failed replace by moving: %s to %s",
+                      journal.stagingUrl.c_str(), journal.oldUrl.c_str());
+        if (const auto moved = services_.fileManager.moveItemAtURL(journal.stagingUrl, journal.oldUrl); !moved)
+            return failed(&moved.error());
+    }
+    if (!state->settled)
         return {};
-    if (log.writes(logLevelDebug))
-        log.write(logLevelDebug, recoverFunction, "Recovering from failed replace by moving: %s to %s",
-                  journal.stagingUrl.c_str(), journal.oldUrl.c_str());
-    if (const auto moved = services_.fileManager.moveItemAtURL(journal.stagingUrl, journal.oldUrl); !moved)
-        return failed(&moved.error());
-    if (orderBetween(journal.oldUrl.deletingLastPathComponent(), services_.configuration.replaceDirectory()) < 0)
+    const FileURL place = (journal.*state->settled).deletingLastPathComponent();
+    if (orderBetween(place, services_.configuration.replaceDirectory()) < 0)
         return failed(nullptr);
     return {};
 }

@@ -188,25 +188,25 @@ std::uint64_t ZORClientConnection::sweepStaging() {
         return 0;
     }
     const auto kept = stagedByJournals();
+    if (!kept)
+        return 0;
     std::uint64_t swept = 0;
     for (const FileURL& entry : *entries)
-        if (!kept.contains(entry.lastPathComponent()))
+        if (!kept->contains(entry.lastPathComponent()))
             swept += _moveItemAtURLToDeathRow(entry, StartDeletionThread::no) ? 1 : 0;
     for (const FileURL& leftover : services_.fileManager.copyLeftoversInDirectoryAtURL(staging))
         (void)_moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
     return swept;
 }
 
-std::set<std::string, std::less<>> ZORClientConnection::stagedByJournals() {
+std::optional<std::set<std::string, std::less<>>> ZORClientConnection::stagedByJournals() {
     std::set<std::string, std::less<>> names;
     const auto items = services_.fileManager.urlsForItemsInDirectoryAtURL(services_.configuration.replaceDirectory());
-    if (!items)
-        return names;
-    // There are some only when the recovery stopped.
-    for (const FileURL& item : *items)
-        if (const auto journal =
-                ReplaceJournal::_readAndValidateReplaceFileAtUrl(services_.log, services_.fileManager, item))
-            names.emplace(journal->stagingUrl.lastPathComponent());
+    if (!items && !items.error().isPosix(ENOENT))
+        return std::nullopt;
+    // There are some only when the recovery stopped, perhaps because they could not be read: their names tell.
+    for (const FileURL& item : items.value_or(std::vector<FileURL>()))
+        names.emplace(ReplaceJournal::stagingNameFor(item));
     return names;
 }
 
