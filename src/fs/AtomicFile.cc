@@ -1,7 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/AtomicFile.h"
 
-#include "fs/BulkDirectoryRead.h"
 #include "platform/FileDescriptor.h"
 #include "platform/linux/Openat2.h"
 
@@ -9,7 +8,6 @@
 #include <fcntl.h>
 #include <string_view>
 #include <sys/random.h>
-#include <vector>
 
 namespace zor::fs {
 
@@ -21,25 +19,10 @@ constexpr std::size_t randomCharacters = 6;
 constexpr int namesTriedMax = 16;
 
 constexpr std::string_view temporaryMark = ".new-";
-
-std::string temporaryPrefix(const std::string& name) {
-    return "." + name + std::string(temporaryMark);
-}
-
-/// What stops before their rename left of earlier writes of the same target.
-void removeLeftovers(platform::Disk& disk, int directory, const std::string& prefix) {
-    const auto listing = platform::openBeneath(directory, ".", O_RDONLY | O_DIRECTORY);
-    if (!listing)
-        return;
-    std::vector<std::string> leftovers;
-    BulkDirectoryRead::Buffer buffer;
-    BulkDirectoryRead entries(listing->get(), buffer);
-    while (const auto* entry = entries.next())
-        if (std::string_view(entry->name).starts_with(prefix))
-            leftovers.emplace_back(entry->name);
-    for (const std::string& leftover : leftovers)
-        disk.unlinkFile(directory, leftover.c_str());
-}
+/// Of the one name that a target's writes use, so that the next one finds what a stop left of the last: looking for it
+/// would be a walk of a directory that its owner may have filled.
+constexpr std::string_view usualSuffix = "000000";
+static_assert(usualSuffix.size() == randomCharacters);
 
 } // namespace
 
@@ -74,10 +57,12 @@ int writeNewFile(platform::Disk& disk, int directory, const char* name, mode_t m
 
 int replaceFileDurably(platform::Disk& disk, int directory, const std::string& name, mode_t mode,
                        std::span<const std::uint8_t> bytes) {
-    const std::string prefix = temporaryPrefix(name);
-    removeLeftovers(disk, directory, prefix);
-    std::string temporary;
-    int descriptor = -EEXIST;
+    const std::string prefix = "." + name + std::string(temporaryMark);
+    std::string temporary = prefix + std::string(usualSuffix);
+    int descriptor = writeNewFile(disk, directory, temporary.c_str(), mode, bytes);
+    if (descriptor == -EEXIST && disk.unlinkFile(directory, temporary.c_str()) == 0)
+        descriptor = writeNewFile(disk, directory, temporary.c_str(), mode, bytes);
+    // The directory's owner holds that name.
     for (int tried = 0; descriptor == -EEXIST && tried < namesTriedMax; ++tried) {
         temporary = uniqueName(prefix);
         descriptor = writeNewFile(disk, directory, temporary.c_str(), mode, bytes);

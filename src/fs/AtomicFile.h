@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // Replacing a file in one step: the old content or the new one, whole, whenever somebody looks or the power goes.
 //
-// A temporary file ("." and a random name) in the same directory is written and synced, renamed over the target, and
+// A temporary file (its name begins with ".") in the same directory is written and synced, renamed over the target, and
 // the directory is synced. A stop before the rename leaves the temporary file, which no listing shows; the next write
-// of the same target removes what earlier stops left of it. Any thread; writers of one target are serialised by their
+// of the same target removes it. Any thread; writers of one target are serialised by their
 // callers.
 #pragma once
 
