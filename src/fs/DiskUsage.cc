@@ -66,7 +66,7 @@ public:
     Measurement(int root, const std::string& rootPath, const UsageLog& log)
         : root_(root), rootPath_(rootPath), log_(log), traits_(traitsOf(root)) {}
 
-    std::uint64_t run();
+    Usage run();
 
 private:
     void measureDirectory(const std::string& path);
@@ -79,8 +79,8 @@ private:
     void measureDepthFirst(int parent, const std::string& path, const char* name);
     void addWalkEntry(const WalkEntry& entry, const std::string& top);
 
-    void sayUnopened(const std::string& path, int error) const;
-    void sayUnexamined(const std::string& path, std::uint64_t index, int error) const;
+    void sayUnopened(const std::string& path, int error);
+    void sayUnexamined(const std::string& path, std::uint64_t index, int error);
     void sayEmpty(const std::string& path) const;
     [[nodiscard]] bool logs(int level) const { return log_.write && level <= log_.levelMax; }
     [[nodiscard]] std::string fullPath(const std::string& path) const {
@@ -92,7 +92,7 @@ private:
     const UsageLog& log_;
     const FileSystemTraits traits_;
     dev_t device_ = 0;
-    std::uint64_t total_ = 0;
+    Usage usage_;
     std::unordered_set<ino_t> seen_;
     /// Relative to the root, which is "".
     std::deque<std::string> queue_;
@@ -100,11 +100,11 @@ private:
     BulkDirectoryRead::Buffer buffer_;
 };
 
-std::uint64_t Measurement::run() {
+Usage Measurement::run() {
     struct stat status{};
     if (::fstat(root_, &status) != 0 || ::lseek(root_, 0, SEEK_SET) < 0) {
         sayUnopened({}, errno);
-        return 0;
+        return usage_;
     }
     device_ = status.st_dev;
     queue_.emplace_back();
@@ -114,7 +114,7 @@ std::uint64_t Measurement::run() {
         queuedBytes_ -= path.size();
         measureDirectory(path);
     }
-    return total_;
+    return usage_;
 }
 
 void Measurement::measureDirectory(const std::string& path) {
@@ -157,6 +157,7 @@ void Measurement::measureEntries(int directory, const std::string& path) {
             addDirectory(directory, path, entry->name);
         }
     }
+    usage_.cutShort |= isOwnShortage(entries.error());
     if (entries.error() != 0 && logs(logLevelError))
         log_.write(logLevelError,
                    formatted("scanbatch on entry %llu in %s returned error %s", static_cast<unsigned long long>(index),
@@ -180,7 +181,7 @@ void Measurement::addDirectory(int directory, const std::string& path, const cha
 template <typename MakePath>
 void Measurement::addNonDirectory(const struct stat& status, MakePath makePath) {
     if (status.st_nlink == 1 || seen_.insert(status.st_ino).second)
-        total_ += static_cast<std::uint64_t>(status.st_blocks) * blockBytes;
+        usage_.bytes += static_cast<std::uint64_t>(status.st_blocks) * blockBytes;
     else if (logs(logLevelDebug))
         log_.write(logLevelDebug, formatted("Skipping hardlinked file at %s", ZOR_SHOWN(fullPath(makePath()))));
 }
@@ -225,13 +226,15 @@ void Measurement::addWalkEntry(const WalkEntry& entry, const std::string& top) {
     }
 }
 
-void Measurement::sayUnopened(const std::string& path, int error) const {
+void Measurement::sayUnopened(const std::string& path, int error) {
+    usage_.cutShort |= isOwnShortage(error);
     if (logs(logLevelError))
         log_.write(logLevelError,
                    formatted("Failed to open directory %s : %s", ZOR_SHOWN(fullPath(path)), errorText(error)));
 }
 
-void Measurement::sayUnexamined(const std::string& path, std::uint64_t index, int error) const {
+void Measurement::sayUnexamined(const std::string& path, std::uint64_t index, int error) {
+    usage_.cutShort |= isOwnShortage(error);
     if (logs(logLevelError))
         log_.write(logLevelError, formatted("Got error %s while processing entry %llu in %s", errorText(error),
                                             static_cast<unsigned long long>(index), ZOR_SHOWN(fullPath(path))));
@@ -244,7 +247,7 @@ void Measurement::sayEmpty(const std::string& path) const {
 
 } // namespace
 
-std::uint64_t diskUsage(int directory, const std::string& path, const UsageLog& log) {
+Usage diskUsage(int directory, const std::string& path, const UsageLog& log) {
     return Measurement(directory, path, log).run();
 }
 

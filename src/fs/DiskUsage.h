@@ -21,7 +21,13 @@ struct UsageLog {
     int levelMax = 3;
 };
 
+struct Usage {
+    std::uint64_t bytes = 0;
+    /// This process ran out of descriptors or memory meanwhile: some of the tree is not in it.
+    bool cutShort = false;
+};
+
 /// `path` names the directory, open for reading, in messages and serves nothing else. Its offset is moved.
-std::uint64_t diskUsage(int directory, const std::string& path, const UsageLog& log);
+Usage diskUsage(int directory, const std::string& path, const UsageLog& log);
 
 } // namespace zor::fs

@@ -13,6 +13,7 @@
 
 #include "daemon/base/FileURL.h"
 #include "daemon/base/Result.h"
+#include "fs/DiskUsage.h"
 #include "fs/PathResolver.h"
 #include "fs/TreeWalker.h"
 #include "platform/Disk.h"
@@ -85,7 +86,7 @@ public:
     /// Allocated bytes of everything below that is no directory, hard links once.
     [[nodiscard]] std::uint64_t diskUsageForURL(const FileURL& url);
     /// The same of a directory that was opened before; `url` is its name in messages.
-    [[nodiscard]] std::uint64_t diskUsageOfDirectory(const fs::OpenResult& directory, const FileURL& url);
+    [[nodiscard]] fs::Usage diskUsageOfDirectory(const fs::OpenResult& directory, const FileURL& url);
 
     // Existence. An item that cannot be examined neither exists nor does not exist.
     [[nodiscard]] bool itemExistsAtURL(const FileURL& url);

@@ -330,15 +330,15 @@ std::uint64_t ZORFileManager::diskUsageForURL(const FileURL& url) {
         log_.write(logLevelError, function, "Failed to get path to url %s", url.c_str());
         return 0;
     }
-    return diskUsageOfDirectory(resolver_.openDirectory(url), url);
+    return diskUsageOfDirectory(resolver_.openDirectory(url), url).bytes;
 }
 
-std::uint64_t ZORFileManager::diskUsageOfDirectory(const fs::OpenResult& directory, const FileURL& url) {
+fs::Usage ZORFileManager::diskUsageOfDirectory(const fs::OpenResult& directory, const FileURL& url) {
     constexpr const char* function = "diskUsageForURL";
     if (!directory) {
         log_.write(logLevelError, function, "Failed to open directory %s : %s", url.c_str(),
                    errorText(directory.error()));
-        return 0;
+        return {.bytes = 0, .cutShort = isOwnShortage(directory.error())};
     }
     fs::UsageLog usageLog;
     usageLog.write = [&](int level, const std::string& message) { log_.writeText(level, function, message); };

@@ -20,12 +20,21 @@ namespace {
 constexpr const char* function = "diskUsageForUserId";
 const std::string staticDiskUsageKey(ipc::infoKeys::staticDiskUsage);
 
+/// Any number counts, read as an unsigned one.
+std::optional<std::uint64_t> numberIn(const plist::Value& value) {
+    if (const auto number = value.asSigned())
+        return static_cast<std::uint64_t>(*number);
+    if (const double* real = value.asReal(); real && *real > -1 && *real < 0x1p64)
+        return static_cast<std::uint64_t>(*real);
+    return value.asUnsigned();
+}
+
 } // namespace
 
 std::optional<std::uint64_t> ZORClientConnection::keptDiskUsage(const ContainerAddress& address) {
     const auto value = infoValueForKey(&staticDiskUsageKey, address, UseLocking::no);
     if (value)
-        return value->asUnsigned();
+        return numberIn(*value);
     if (!value.error().is(ErrorCode::infoKeyNotFound))
         services_.log.write(
             logLevelError, function, "Error looking up info value for userId: %u, identifier: %s, Class: %llu: %llu",
@@ -63,13 +72,13 @@ Result<std::uint64_t> ZORClientConnection::diskUsage(const ContainerAddress& add
         container = record->url();
         directory = services_.fileManager.resolver().openDirectory(container);
     }
-    const std::uint64_t bytes = [&] {
+    const fs::Usage usage = [&] {
         const platform::BlockingScope blocking; // a large tree must not take one of the few threads from all clients
         return services_.fileManager.diskUsageOfDirectory(directory, container);
     }();
-    if (isBundle)
-        keepDiskUsage(address, container, bytes);
-    return bytes;
+    if (isBundle && !usage.cutShort)
+        keepDiskUsage(address, container, usage.bytes);
+    return usage.bytes;
 }
 
 ZORClientConnection::DiskUsageAnswer ZORClientConnection::diskUsageForUserId(const ContainerAddress& address) {

@@ -133,7 +133,7 @@ Outcome<Progress> putContent(zor::platform::Disk& disk, int container, const Sou
     Outcome<void> done;
     if (source.isDirectory()) {
         if (observer.wantsShare)
-            course.expectBytes(zor::fs::diskUsage(source.get(), {}, {}));
+            course.expectBytes(zor::fs::diskUsage(source.get(), {}, {}).bytes);
         done = DirectoryCopy(status, course).copy(disk, source, *sealed);
     } else {
         done = unpack(disk, *sealed, source, {.user = status.st_uid, .group = status.st_gid}, course);

@@ -1,0 +1,105 @@
+// SPDX-License-Identifier: Apache-2.0
+// What the daemon could not look at, for want of descriptors or because the disk refused: it deletes nothing for that,
+// and keeps no answer that came of it.
+#include "store/FewDescriptors.h"
+#include "store/operations/ReplaceJournal.h"
+#include "world/World.h"
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+namespace zor::test {
+namespace {
+
+constexpr rlim_t descriptorsMax = 24;
+
+class Shortage : public testing::Test {
+protected:
+    Shortage() { world.load(); }
+
+    FoundContainer make(const std::string& identifier, ContainerClass containerClass) {
+        return world.daemonsClient()
+            .createOrLookupContainerForUser(isBundleClass(containerClass) ? 33 : mobile, &identifier, containerClass,
+                                            {.createIfNecessary = true})
+            .value();
+    }
+    [[nodiscard]] std::string relative(const std::string& path) const { return path.substr(world.path().size() + 1); }
+    /// The daemon ended after the first of a replace's two moves.
+    void stopAReplaceOf(const FoundContainer& old) {
+        StoreServices& store = world.services().store();
+        const UUID uuid = UUID::random();
+        const FileURL oldUrl = FileURL::directory(old.path);
+        const ReplaceJournal journal{.oldUrl = oldUrl,
+                                     .newUrl = oldUrl,
+                                     .stagingUrl =
+                                         store.configuration.stagingDirectory().appendingDirectory(uuid.string()),
+                                     .destUrl = oldUrl};
+        ASSERT_TRUE(journal._writeToDiskReplaceAt(
+            store.log, store.fileManager, ReplaceJournal::urlFor(store.configuration.replaceDirectory(), uuid)));
+        ASSERT_TRUE(store.fileManager.moveItemAtURL(oldUrl, journal.stagingUrl));
+    }
+    void launch() {
+        world.restart();
+        world.load();
+        world.daemonsClient().containerManagerSetup();
+        world.drainDeathRow();
+    }
+
+    World world;
+};
+
+// Goal: a launch that cannot read the journals deletes nothing that they name. Method: a stopped replace, a launch in
+// which the Replace directory is something else or descriptors are few, then a launch as it should be.
+TEST_F(Shortage, JournalsThatCannotBeReadKeepWhatTheyName) {
+    const FoundContainer old = make("old", ContainerClass::dataApplication);
+    const std::string content = relative(old.path) + "/content";
+    const std::string journals = std::string(libraryPath) + "/Replace";
+    world.write(content, "old");
+    for (rlim_t left = 0; left <= descriptorsMax; ++left) {
+        SCOPED_TRACE(left);
+        stopAReplaceOf(old);
+        if (left == descriptorsMax) {
+            ASSERT_EQ(::rename(world.path(journals).c_str(), world.path(journals + ".aside").c_str()), 0);
+            world.write(journals, "no directory");
+            launch();
+            ASSERT_EQ(::unlink(world.path(journals).c_str()), 0);
+            ASSERT_EQ(::rename(world.path(journals + ".aside").c_str(), world.path(journals).c_str()), 0);
+        } else {
+            world.restart();
+            world.load();
+            const FewDescriptors few(left);
+            world.daemonsClient().containerManagerSetup();
+        }
+        launch();
+        ASSERT_EQ(world.read(content), "old");
+    }
+}
+
+// Goal: a bundle's size that was measured in part is not kept as its size. Method: first measured with each number of
+// descriptors left, then with all.
+TEST_F(Shortage, ASizeMeasuredInPartIsNotKept) {
+    int inPart = 0;
+    for (rlim_t left = 0; left < descriptorsMax; ++left) {
+        SCOPED_TRACE(left);
+        const FoundContainer bundle = make("size" + std::to_string(left), ContainerClass::bundleApplication);
+        world.makeDirectories(relative(bundle.path) + "/a/b");
+        world.write(relative(bundle.path) + "/a/b/file", std::string(100'000, 'x'));
+        const ZORClientConnection::ContainerAddress address{.userId = 33,
+                                                            .uuid = bundle.uuid,
+                                                            .identifier = bundle.record->identifier(),
+                                                            .containerClass = ContainerClass::bundleApplication};
+        std::uint64_t measured = 0;
+        {
+            const FewDescriptors few(left);
+            measured = world.daemonsClient().diskUsageForUserId(address).bytes;
+        }
+        const auto whole = world.daemonsClient().diskUsageForUserId(address);
+        EXPECT_EQ(whole.error, ErrorCode::success);
+        EXPECT_GE(whole.bytes, 100'000U);
+        inPart += measured < whole.bytes ? 1 : 0;
+    }
+    EXPECT_GT(inPart, 1);
+}
+
+} // namespace
+} // namespace zor::test
