@@ -185,7 +185,7 @@ Result<void> ZORFileManager::setDataProtectionClassOfEntry(
         return {};
     struct stat status{};
     if (!item || ::fstat(item->get(), &status) != 0) {
-        const int number = item ? errno : item.error();
+        const int number = platform::neverLocked(item ? errno : item.error());
         return posixError(ZOR_HERE, number, "Failed to open %s : %s", ZOR_SHOWN(path), errorText(number));
     }
     if (!S_ISREG(status.st_mode))

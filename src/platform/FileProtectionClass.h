@@ -2,12 +2,19 @@
 // Data-protection class of an open file or directory.
 #pragma once
 
+#include <cerrno>
 #include <expected>
 
 namespace zor::platform {
 
 /// The class that a file without a recorded one has.
 inline constexpr int defaultProtectionClass = 3;
+
+/// An errno of the kernel's for who takes EPERM for a locked device: an immutable file, a listener that forbids an
+/// open, are none.
+[[nodiscard]] constexpr int neverLocked(int error) {
+    return error == EPERM ? EACCES : error;
+}
 
 class FileProtectionClass {
 public:

@@ -50,7 +50,7 @@ std::expected<std::optional<int>, int> XattrProtectionClass::classIn(int fd, con
             return std::nullopt;
         if (errno == ERANGE) // a longer value is no number of ours
             return defaultProtectionClass;
-        return std::unexpected(errno == EPERM ? EACCES : errno);
+        return std::unexpected(neverLocked(errno));
     }
     int protectionClass = 0;
     const auto [end, error] = std::from_chars(text, text + bytes, protectionClass);
@@ -74,7 +74,7 @@ int XattrProtectionClass::setClass(int fd, int protectionClass) {
         disk_.setAttribute(fd, attribute_, {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()});
     if (set == -EOPNOTSUPP)
         supported_.store(false, std::memory_order_relaxed);
-    return set == -EPERM ? EACCES : -set;
+    return neverLocked(-set);
 }
 
 } // namespace zor::platform
