@@ -35,24 +35,44 @@ unsigned long long number(ContainerClass containerClass) {
 } // namespace
 
 void ZORDataProtectionChangeOperation::performChangeOperation() {
+    conclude(services_.boundary.run({performFunction, __LINE__}, [&] { return attempt(); }));
+}
+
+void ZORDataProtectionChangeOperation::retry() {
+    conclude(services_.boundary.run({performFunction, __LINE__}, [&] {
+        startRetry();
+        return attempt();
+    }));
+}
+
+void ZORDataProtectionChangeOperation::startRetry() {
+    if (!retried_ && retryStartBlock_)
+        retryStartBlock_();
+    if (std::exchange(retried_, true))
+        std::this_thread::sleep_for(retryInterval);
+}
+
+Result<ZORDataProtectionChangeOperation::NeedRetry> ZORDataProtectionChangeOperation::attempt() {
+    const platform::BlockingScope blocking; // a large tree must not take one of the few threads from all clients
+    const NeedRetry needRetry = TRY(_runChangeOperationNeedToRetry());
+    if (needRetry == NeedRetry::yes && retryIfLocked_ == RetryIfLocked::yes)
+        queueRetry();
+    return needRetry;
+}
+
+void ZORDataProtectionChangeOperation::conclude(const Result<NeedRetry>& attempted) {
     const ZORMetadata& container = *dataContainerMetadata_;
-    const auto pass = services_.boundary.run({performFunction, __LINE__}, [&]() -> Result<NeedRetry> {
-        const platform::BlockingScope blocking; // a large tree must not take one of the few threads from all clients
-        return _runChangeOperationNeedToRetry();
-    });
-    const bool locked = pass && *pass == NeedRetry::yes;
+    const bool locked = attempted && *attempted == NeedRetry::yes;
+    if (locked && retryIfLocked_ == RetryIfLocked::yes)
+        return; // another thread may be at the retry by now
     std::optional<ZORError> error;
-    if (!pass) {
-        error = pass.error();
+    if (!attempted) {
+        error = attempted.error();
         services_.log.write(logLevelNotice, performFunction,
                             "Operation to update protection classes for user: %u, id: %s, containerClass: %llu to "
                             "class %d failed with error %s",
                             container.uid(), ZOR_SHOWN(container.identifier()), number(container.containerClass()),
                             newDataProtectionClass_, error->text().c_str());
-    }
-    if (locked && retryIfLocked_ == RetryIfLocked::yes) {
-        queueRetry();
-        return;
     }
     if (locked)
         error =
@@ -74,14 +94,6 @@ void ZORDataProtectionChangeOperation::queueRetry() {
         number(container.containerClass()));
     ZORDispatchAsyncWithTransaction(services_.transactions, services_.lockStateQueue,
                                     [self = shared_from_this()] { self->retry(); });
-}
-
-void ZORDataProtectionChangeOperation::retry() {
-    if (!retried_ && retryStartBlock_)
-        retryStartBlock_();
-    if (std::exchange(retried_, true))
-        std::this_thread::sleep_for(retryInterval);
-    performChangeOperation();
 }
 
 Result<ZORDataProtectionChangeOperation::NeedRetry> ZORDataProtectionChangeOperation::_runChangeOperationNeedToRetry() {

@@ -64,8 +64,13 @@ public:
 private:
     enum class NeedRetry : bool { no, yes };
     Result<NeedRetry> _runChangeOperationNeedToRetry();
-    void queueRetry();
     void retry();
+    void startRetry();
+    /// A pass, and where it has to come again, its queueing.
+    Result<NeedRetry> attempt();
+    void queueRetry();
+    /// Calls the completion, unless a retry is queued.
+    void conclude(const Result<NeedRetry>& attempted);
 
     /// The open container, as it was when the change was asked for; errors 21, 10, or the system's.
     Result<platform::FileDescriptor> openContainer();
