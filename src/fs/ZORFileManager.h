@@ -28,6 +28,10 @@
 
 namespace zor {
 
+namespace fs {
+class NamesMet;
+}
+
 enum class Intermediates { no, yes };
 
 /// A protection-class argument that leaves the class alone.
@@ -73,7 +77,8 @@ public:
     /// Every entry of the tree to the visitor, directories before and after what they hold.
     Result<void> _traverseDirectory(const FileURL& url,
                                     const std::function<Result<void>(const fs::WalkEntry&)>& visitor);
-    /// Owner of everything but metadata files; 0755 for directories and what has an execute bit, else 0644.
+    /// Owner of everything but metadata files; 0755 for directories and what has an execute bit, else 0644. A file with
+    /// a name outside the tree is left alone.
     Result<void> standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid);
     /// The entries whose names do not begin with ".", in the directory's order.
     Result<std::vector<FileURL>> urlsForItemsInDirectoryAtURL(const FileURL& directory);
@@ -101,7 +106,7 @@ public:
                                                    const std::function<bool(int)>& predicate = nullptr);
     /// The same for a directory or regular file that a walk has met; `path` names it in messages. What is opened
     /// counts, and `predicate` gets its status too: what is of another kind by now is left alone, as if it had gone
-    /// before.
+    /// before. EPERM means that the device is locked, and nothing else.
     Result<void>
     setDataProtectionClassOfEntry(const fs::WalkEntry& entry, const std::string& path, int protectionClass,
                                   const std::function<bool(const struct stat& status, int current)>& predicate);
@@ -131,7 +136,8 @@ private:
                                   const DirectoryAttributes& attributes);
     Result<void> applyAttributes(int parent, const std::string& name, const std::string& path,
                                  const DirectoryAttributes& attributes);
-    void standardizeEntry(int parent, const char* name, const std::string& path, uid_t uid, gid_t gid);
+    void standardizeEntry(int parent, const char* name, const std::string& path, uid_t uid, gid_t gid,
+                          fs::NamesMet& namesMet);
 
     const Log& log_;
     platform::Disk& disk_;

@@ -5,6 +5,7 @@
 #include "fs/DiskUsage.h"
 #include "fs/LeftoverNames.h"
 #include "fs/MetadataFileName.h"
+#include "fs/NamesMet.h"
 #include "fs/RecursiveCopy.h"
 #include "fs/RecursiveRemove.h"
 #include "fs/ZORFileManager.h"
@@ -30,6 +31,12 @@ std::string below(const FileURL& root, const std::string& relative) {
 /// 0755 for directories and whatever somebody may execute, else 0644.
 mode_t standardMode(mode_t mode) {
     return S_ISDIR(mode) || (mode & 0111) ? 0755 : 0644;
+}
+
+/// Whether the names in an open directory are in nobody's hands but the owner's.
+bool namesAreOf(uid_t owner, int directory) {
+    struct stat status{};
+    return ::fstat(directory, &status) == 0 && status.st_uid == owner && (status.st_mode & (S_IWGRP | S_IWOTH)) == 0;
 }
 
 } // namespace
@@ -212,7 +219,8 @@ Result<void> ZORFileManager::_traverseDirectory(const FileURL& url,
     return {};
 }
 
-void ZORFileManager::standardizeEntry(int parent, const char* name, const std::string& path, uid_t uid, gid_t gid) {
+void ZORFileManager::standardizeEntry(int parent, const char* name, const std::string& path, uid_t uid, gid_t gid,
+                                      fs::NamesMet& namesMet) {
     constexpr const char* function = "standardizeOwnershipAtURL";
     const auto item = platform::openBeneath(parent, name, O_PATH | O_NOFOLLOW);
     struct stat status{};
@@ -222,8 +230,10 @@ void ZORFileManager::standardizeEntry(int parent, const char* name, const std::s
             log_.write(logLevelError, function, "Could not chown %s: %s", ZOR_SHOWN(path), errorText(number));
         return;
     }
-    // A file with another name elsewhere may belong to somebody else's tree.
-    const bool sharedElsewhere = !S_ISDIR(status.st_mode) && status.st_nlink > 1;
+    // A file with another name elsewhere may belong to somebody else's tree. A name counts once its directory has been
+    // given away: before, the former owner could move it on and have it counted again.
+    const bool sharedElsewhere =
+        !S_ISDIR(status.st_mode) && status.st_nlink > 1 && !(namesAreOf(uid, parent) && namesMet.wasLast(status));
     if (!sharedElsewhere && (status.st_uid != uid || status.st_gid != gid))
         if (const int changed = disk_.changeOwner(item->get(), uid, gid); changed < 0)
             log_.write(logLevelError, function, "Could not chown %s: %s", ZOR_SHOWN(path), errorText(-changed));
@@ -235,11 +245,12 @@ void ZORFileManager::standardizeEntry(int parent, const char* name, const std::s
 
 Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid) {
     const bool rootIsMetadata = url.path().find(names::metadataFile) != std::string::npos;
+    fs::NamesMet namesMet;
     Result<void> walked = _traverseDirectory(url, [&](const WalkEntry& entry) -> Result<void> {
         const std::string path = below(url, entry.path());
         if (entry.kind != WalkEntryKind::directoryEnd && !entry.onOtherFileSystem &&
             path.find(names::metadataFile) == std::string::npos)
-            standardizeEntry(entry.parent, entry.name, path, uid, gid);
+            standardizeEntry(entry.parent, entry.name, path, uid, gid, namesMet);
         return {};
     });
     const auto parent = resolver_.openParent(url);
@@ -247,8 +258,9 @@ Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t
     const int failure = parent ? resolver_.status(url, status) : parent.error();
     if (failure != 0)
         return posixError(ZOR_HERE, failure, "Could not stat %s: %s", url.c_str(), errorText(failure));
+    fs::NamesMet again; // the root's name has been counted
     if (!rootIsMetadata)
-        standardizeEntry(parent->directory.get(), parent->name.c_str(), url.path(), uid, gid);
+        standardizeEntry(parent->directory.get(), parent->name.c_str(), url.path(), uid, gid, again);
     return walked;
 }
 

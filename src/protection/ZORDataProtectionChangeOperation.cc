@@ -105,7 +105,7 @@ Result<ZORDataProtectionChangeOperation::NeedRetry> ZORDataProtectionChangeOpera
         items = existingItems();
         if (items.empty())
             return NeedRetry::no;
-        container = TRY(openContainer());
+        container = TRY(openContainer(items));
     }
     const auto walked = walk(container.get(), items);
     if (!walked && walked.error().isPosix(EPERM))
@@ -143,17 +143,28 @@ std::vector<ZORDataProtectionChangeOperation::Item> ZORDataProtectionChangeOpera
     return items;
 }
 
-Result<platform::FileDescriptor> ZORDataProtectionChangeOperation::openContainer() {
-    const FileURL url = dataContainerMetadata_->url();
-    auto opened = services_.fileManager.resolver().openDirectory(url);
-    if (!opened)
-        return posixError({passFunction, __LINE__}, opened.error(), "fts_open failed for %s : %s", url.c_str(),
-                          errorText(opened.error()));
+std::string ZORDataProtectionChangeOperation::shown(const std::vector<Item>& items) {
+    plist::Array paths;
+    for (const Item& item : items)
+        paths.emplace_back(item.path);
+    const plist::Value list(std::move(paths));
+    return plist::describe(&list);
+}
+
+Result<platform::FileDescriptor> ZORDataProtectionChangeOperation::openContainer(const std::vector<Item>& items) {
+    auto opened = services_.fileManager.resolver().openDirectory(dataContainerMetadata_->url());
+    struct stat status{};
+    if (!opened || ::fstat(opened->get(), &status) != 0) {
+        const int number = platform::neverLocked(opened ? errno : opened.error());
+        return posixError({passFunction, __LINE__}, number, "fts_open failed for %s : %s", shown(items).c_str(),
+                          errorText(number));
+    }
+    owner_ = status.st_uid;
     return std::move(*opened);
 }
 
 Result<void> ZORDataProtectionChangeOperation::walk(int container, const std::vector<Item>& items) {
-    namesMet_.clear();
+    namesMet_.forgetAll();
     std::optional<ZORError> failure;
     for (const Item& item : items) {
         fs::TreeWalker walker(fs::WalkStatus::typeOnly);
@@ -204,8 +215,7 @@ Result<void> ZORDataProtectionChangeOperation::changeFile(const WalkEntry& entry
     const std::int32_t target = newDataProtectionClass_ == 0 ? classOfFilesForNone : newDataProtectionClass_;
     const bool keepLower = (operationType_ & protectionChange::keepLower) != 0;
     return setClass(entry, path, target, [this, target, keepLower](const struct stat& status, int current) {
-        // A file with a name elsewhere may be somebody else's too.
-        if (status.st_nlink > 1 && !allNamesMet(status))
+        if (isShared(status))
             return true;
         return current == target || current == untouchableClass || (keepLower && target > current);
     });
@@ -232,9 +242,10 @@ Result<void> ZORDataProtectionChangeOperation::setClass(const WalkEntry& entry, 
     return {};
 }
 
-bool ZORDataProtectionChangeOperation::allNamesMet(const struct stat& status) {
-    const auto met = namesMet_.try_emplace(status.st_ino, 0).first;
-    return ++met->second >= status.st_nlink;
+bool ZORDataProtectionChangeOperation::isShared(const struct stat& status) {
+    // The container's owner can rename during the walk, so that one name is met twice; by that he reaches what is his
+    // own anyway, and nothing else.
+    return status.st_nlink > 1 && (status.st_uid != owner_ || !namesMet_.wasLast(status));
 }
 
 } // namespace zor

@@ -3,7 +3,8 @@
 // unlock for as long as a lock gets in the way.
 //
 // The tree belongs to a client, who may change it during the walk. Classes are set on descriptors of what the walk met,
-// never by a name; nothing outside the container is touched, and a file that has names outside is left as it is.
+// never by a name; nothing outside the container is touched. A file that has names outside is left as it is, and so is
+// one with several names that does not belong to the container's owner: he can make its names seem to be all inside.
 //
 // A pass holds a lock while it looks the container up and opens it, and again afterwards to see that it is still the
 // same container at the same place; not in between, since every lookup of any client waits for such locks. The lookup
@@ -16,6 +17,7 @@
 #pragma once
 
 #include "daemon/ZORClientConnection.h"
+#include "fs/NamesMet.h"
 #include "fs/TreeWalker.h"
 
 #include <cstdint>
@@ -23,7 +25,6 @@
 #include <memory>
 #include <optional>
 #include <string>
-#include <unordered_map>
 #include <vector>
 
 namespace zor {
@@ -72,8 +73,6 @@ private:
     /// Calls the completion, unless a retry is queued.
     void conclude(const Result<NeedRetry>& attempted);
 
-    /// The open container, as it was when the change was asked for; errors 21, 10, or the system's.
-    Result<platform::FileDescriptor> openContainer();
     /// Errors 21, 10.
     Result<void> checkStillThere();
     struct Item {
@@ -81,6 +80,8 @@ private:
         std::string path;
     };
     std::vector<Item> existingItems();
+    static std::string shown(const std::vector<Item>& items);
+    Result<platform::FileDescriptor> openContainer(const std::vector<Item>& items);
     Result<void> walk(int container, const std::vector<Item>& items);
     Result<void> visit(const fs::WalkEntry& entry, const Item& item);
     Result<void> changeDirectory(const fs::WalkEntry& entry, const std::string& path);
@@ -88,7 +89,8 @@ private:
     using Declines = std::function<bool(const struct stat& status, int current)>;
     Result<void> setClass(const fs::WalkEntry& entry, const std::string& path, std::int32_t target,
                           const Declines& declines);
-    [[nodiscard]] bool allNamesMet(const struct stat& status);
+    /// Whether a file, met under one of its names, may be somebody else's too.
+    [[nodiscard]] bool isShared(const struct stat& status);
 
     StoreServices& services_;
     const std::shared_ptr<const ZORMetadata> dataContainerMetadata_;
@@ -98,8 +100,9 @@ private:
     bool retried_ = false;
     std::function<void()> retryStartBlock_;
     CompletionBlock completionBlock_;
-    /// Of one pass: how many names were met of each file that has several.
-    std::unordered_map<ino_t, nlink_t> namesMet_;
+    // Of one pass.
+    uid_t owner_ = 0; // the container's
+    fs::NamesMet namesMet_;
 };
 
 } // namespace zor
