@@ -2,6 +2,7 @@
 // Changing the data-protection class of a container: what is judged, what is set where, what waits for an unlock, and
 // what happens to the container meanwhile.
 #include "protection/ZORApplicationTerminationAssertion.h"
+#include "protection/ZORDataProtectionChangeOperation.h"
 #include "protection/ZORDataProtectionManager.h"
 #include "store/DispatchFixture.h"
 
@@ -10,6 +11,8 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <mutex>
+#include <poll.h>
+#include <sys/fanotify.h>
 #include <sys/file.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
@@ -315,7 +318,16 @@ TEST_F(Protection, HostileOwner) {
     ASSERT_EQ(::link(world.path("etc/outside/file").c_str(), (documents + "/hard").c_str()), 0);
     put("Documents/one", 3);
     ASSERT_EQ(::link((documents + "/one").c_str(), world.path(path + "/Library/two").c_str()), 0);
+    if (::geteuid() == 0) { // else all files are the owner's own
+        ASSERT_EQ(::chown((documents + "/one").c_str(), mobile, mobile), 0);
+        // Between the two directories the owner moves another's file on, so that its one name is met twice.
+        world.disk().arm({.filter = [&](const auto&) {
+            ::rename((documents + "/hard").c_str(), world.path(path + "/Library/hard").c_str());
+            return false;
+        }});
+    }
     EXPECT_EQ(change(to(1)), 1U);
+    world.disk().disarm();
     EXPECT_EQ(outside(), 3);
     EXPECT_EQ(classOf("Documents/one"), 1); // all its names are in the container
     ASSERT_EQ(::rename((documents + "/link").c_str(), (documents + "/other").c_str()), 0);
@@ -363,6 +375,98 @@ TEST_F(Protection, FailuresOfTheSystem) {
     const auto said = world.log.take();
     EXPECT_TRUE(std::ranges::any_of(
         said, [](const auto& one) { return one.message.starts_with("Failed to set protection class info for "); }));
+}
+
+/// Refuses every open of a file or directory, as one whom root lets watch it may.
+class OpenRefusal {
+public:
+    explicit OpenRefusal(const std::string& path)
+        : watch_(::fanotify_init(FAN_CLASS_CONTENT | FAN_CLOEXEC, O_RDONLY | O_CLOEXEC)) {
+        works_ = watch_.valid() &&
+                 ::fanotify_mark(watch_.get(), FAN_MARK_ADD, FAN_OPEN_PERM | FAN_ONDIR, AT_FDCWD, path.c_str()) == 0;
+        if (works_)
+            answering_ = std::jthread([this](const std::stop_token& stop) { answer(stop); });
+    }
+    [[nodiscard]] bool works() const { return works_; }
+
+private:
+    void answer(const std::stop_token& stop) {
+        pollfd waiting{.fd = watch_.get(), .events = POLLIN, .revents = 0};
+        fanotify_event_metadata event{};
+        while (!stop.stop_requested())
+            if (::poll(&waiting, 1, 1) == 1 && ::read(watch_.get(), &event, sizeof event) == sizeof event) {
+                const platform::FileDescriptor asked(event.fd);
+                const fanotify_response refused{.fd = event.fd, .response = FAN_DENY};
+                (void)!::write(watch_.get(), &refused, sizeof refused);
+            }
+    }
+
+    platform::FileDescriptor watch_;
+    bool works_ = false;
+    std::jthread answering_;
+};
+
+// Goal: an open that somebody forbids is the change's error; taken for a lock it would be tried again for ever. Method:
+// a listener that refuses the opens of the container, then of a file in it.
+TEST_F(Protection, AForbiddenOpenIsNoLock) {
+    put("Documents/file", 4);
+    Request request = to(1);
+    request.retryIfLocked = true;
+    const std::string root = world.path(path);
+    for (const auto& [refused, line] :
+         {std::pair(root, "fts_open failed for [\"" + root + "/Documents\", \"" + root + "/Library\", "),
+          std::pair(root + "/Documents/file", "Failed to open " + root + "/Documents/file : Permission denied")}) {
+        SCOPED_TRACE(refused);
+        Answers answers;
+        {
+            const OpenRefusal refusal(refused);
+            if (!refusal.works())
+                GTEST_SKIP() << "skipped: needs root, and a kernel that lets an open be refused";
+            manager().setDataProtectionOnDataContainerForUser(request, answers.completion());
+            EXPECT_EQ(answers.wait(), std::vector<std::uint64_t>{EACCES});
+        }
+        (void)answers.wait();
+        EXPECT_TRUE(std::ranges::any_of(world.log.take(), [&](const auto& one) {
+            return one.function == perform && one.message.find(line) != std::string::npos;
+        }));
+    }
+}
+
+class QueueWithoutThread final : public platform::WorkQueue {
+public:
+    void async(std::function<void()>) override { throw std::system_error(EAGAIN, std::generic_category()); }
+    void suspend() override {}
+    void resume() override {}
+};
+
+// Goal: what is thrown around a pass ends the change with 40, as what is thrown in it does, and not the daemon. Method:
+// a queue that gets no thread for the retry, and a retry whose start finds no memory.
+TEST_F(Protection, ExceptionsAroundAPass) {
+    put("Documents/file", 4);
+    lock();
+    Request request = to(1);
+    request.retryIfLocked = true;
+    QueueWithoutThread withoutThread;
+    platform::WorkQueue* const usual = std::exchange(world.lockStateQueue.inner, &withoutThread);
+    EXPECT_EQ(change(request), 40U);
+    world.lockStateQueue.inner = usual;
+    EXPECT_EQ(world.services().platform().transactions.count(), 0U);
+    EXPECT_TRUE(manager().pending().empty());
+
+    using Operation = ZORDataProtectionChangeOperation;
+    const auto record =
+        world.services().cache().containerForUser(mobile, ContainerClass::dataApplication, &*request.identifier, false);
+    ASSERT_TRUE(record);
+    const auto operation = std::make_shared<Operation>(world.services().store(), *record, 1,
+                                                       Operation::RetryIfLocked::yes, protectionChange::directories);
+    Answers answers;
+    operation->setRetryStartBlock([] { throw std::bad_alloc(); });
+    operation->setCompletionBlock([completion = answers.completion()](bool, const std::optional<ZORError>& error) {
+        completion(error ? error->replyCode() : ErrorCode::success);
+    });
+    operation->performChangeOperation();
+    unlock();
+    EXPECT_EQ(answers.wait(), std::vector<std::uint64_t>{40});
 }
 
 // Goal: the reply of command 19 comes exactly once, at once for what is judged at once, and with the code of the
