@@ -57,6 +57,7 @@ TEST(Error, IsLoggedOnceWhereItIsMade) {
     const ZORError bare({"operation", 42}, ErrorDomain::zor, -3, std::nullopt);
     EXPECT_FALSE(bare.description());
     EXPECT_EQ(static_cast<std::uint64_t>(bare.replyCode()), 0xFFFF'FFFF'FFFF'FFFDU);
+    EXPECT_EQ(posixError(ZOR_HERE, EPERM, "x").replyCode(), static_cast<ErrorCode>(EACCES)); // 1 would say success
     EXPECT_FALSE(cause.is(static_cast<ErrorCode>(2)));
 }
 

@@ -18,6 +18,10 @@ bool ZORError::isOwnShortage() const {
     return domain_ == ErrorDomain::posix && zor::isOwnShortage(code_);
 }
 
+ErrorCode ZORError::replyCode() const {
+    return static_cast<ErrorCode>(static_cast<std::int64_t>(isPosix(EPERM) ? EACCES : code_));
+}
+
 void logError(const Log& log, const ZORError& error) {
     if (!error.description())
         return;

@@ -44,8 +44,9 @@ public:
     [[nodiscard]] bool isPosix(int number) const { return domain_ == ErrorDomain::posix && code_ == number; }
     /// Whether its POSIX number is one of those.
     [[nodiscard]] bool isOwnShortage() const;
-    /// What a client gets as "ReplyError": the code, sign-extended from 32 bits.
-    [[nodiscard]] ErrorCode replyCode() const { return static_cast<ErrorCode>(static_cast<std::int64_t>(code_)); }
+    /// What a client gets as "ReplyError": the code, sign-extended from 32 bits. There 1 is success, so EPERM leaves as
+    /// EACCES.
+    [[nodiscard]] ErrorCode replyCode() const;
     /// For a line: domain, code and description, without the cause.
     [[nodiscard]] std::string text() const;
 
