@@ -23,6 +23,8 @@ ZOREntitlementMapping::ZOREntitlementMapping(const Log& log, ZORFileManager& fil
                                              ZORGlobalConfiguration& configuration, StoreServices& services)
     : log_(log), fileManager_(fileManager), configuration_(configuration), services_(services),
       entitlementMappingFileUrl_(configuration.libraryDirectory().appendingFile(names::entitlementFile)),
+      unreadableFileUrl_(
+          entitlementMappingFileUrl_.deletingLastPathComponent().appendingFile(names::unreadableEntitlementFile)),
       entitlementMappingDict_(_readEntitlementMappingFromDisk()) {}
 
 plist::Dictionary ZOREntitlementMapping::_readEntitlementMappingFromDisk() {
@@ -33,44 +35,51 @@ plist::Dictionary ZOREntitlementMapping::_readEntitlementMappingFromDisk() {
                entitlementMappingFileUrl_.c_str());
     if (!map.error().isPosix(ENOENT)) {
         log_.write(logLevelError, __func__, "%s", map.error().text().c_str());
-        moveUnreadableFileAside();
+        if (const auto moved = moveUnreadableFileAside(); !moved)
+            log_.write(logLevelError, __func__, "%s", moved.error().text().c_str());
     }
     return {};
 }
 
-void ZOREntitlementMapping::moveUnreadableFileAside() {
-    const FileURL aside =
-        entitlementMappingFileUrl_.deletingLastPathComponent().appendingFile(names::unreadableEntitlementFile);
+Result<void> ZOREntitlementMapping::moveUnreadableFileAside() {
+    fileIsUnread_ = true;
     // An earlier loss that nobody has looked at is not written over.
-    if (fileManager_.itemExistsAtURL(aside)) {
-        log_.write(logLevelError, __func__, "%s lies there already; the unreadable file is left where it is",
-                   aside.c_str());
-        return;
-    }
-    const auto moved = fileManager_.moveItemAtURL(entitlementMappingFileUrl_, aside);
-    if (moved)
+    if (!fileManager_.itemDoesNotExistAtURL(unreadableFileUrl_)) {
         log_.write(logLevelError, __func__,
-                   "Moved it to %s. Until that file is removed, nothing is deleted for want of an entitlement",
-                   aside.c_str());
-    else
-        log_.write(logLevelError, __func__, "%s", moved.error().text().c_str());
+                   "%s lies there already; the unreadable file is left where it is, until the map is saved",
+                   unreadableFileUrl_.c_str());
+        return {};
+    }
+    TRY(fileManager_.moveItemAtURL(entitlementMappingFileUrl_, unreadableFileUrl_));
+    fileIsUnread_ = false;
+    log_.write(logLevelError, __func__,
+               "Moved it to %s. Until that file is removed, nothing is deleted for want of an entitlement",
+               unreadableFileUrl_.c_str());
+    return {};
+}
+
+bool ZOREntitlementMapping::unreadFileIsInPlace() {
+    return fileIsUnread_ && !fileManager_.itemDoesNotExistAtURL(entitlementMappingFileUrl_);
 }
 
 std::optional<FileURL> ZOREntitlementMapping::lostFile() {
-    FileURL aside =
-        entitlementMappingFileUrl_.deletingLastPathComponent().appendingFile(names::unreadableEntitlementFile);
-    if (fileManager_.itemDoesNotExistAtURL(aside))
-        return std::nullopt;
-    return aside;
+    if (!fileManager_.itemDoesNotExistAtURL(unreadableFileUrl_))
+        return unreadableFileUrl_;
+    if (unreadFileIsInPlace())
+        return entitlementMappingFileUrl_;
+    return std::nullopt;
 }
 
 Result<void> ZOREntitlementMapping::_writeEntitlementMappingToDisk() {
     configuration_.libraryDirectory(); // makes it again should it have gone
-    const auto written = writeToURL(entitlementMappingDict_, entitlementMappingFileUrl_,
-                                    writeAtomically | writeWithoutProtection, entitlementFileBytesMax, fileManager_);
+    auto written = unreadFileIsInPlace() ? moveUnreadableFileAside() : Result<void>();
+    if (written)
+        written = writeToURL(entitlementMappingDict_, entitlementMappingFileUrl_,
+                             writeAtomically | writeWithoutProtection, entitlementFileBytesMax, fileManager_);
     if (!written)
         return makeError(log_, ZOR_HERE, ErrorCode::entitlementFileNotWritten, &written.error(), LogFlag::yes,
                          "Failed to write entitlement mapping file at %s", entitlementMappingFileUrl_.c_str());
+    fileIsUnread_ = false;
     return {};
 }
 

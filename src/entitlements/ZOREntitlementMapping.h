@@ -8,8 +8,9 @@
 // Storing and asking is in ZOREntitlementMapping.cc; what a change of entitlements makes of containers is in
 // ZOREntitlementProcessing.cc; what a boot brings in line, in FirstBootPasses.cc.
 //
-// A stop during a save leaves the old file or the new one. A file that is there but cannot be read is moved aside,
-// never written over: as long as it lies there, nothing may be deleted because the map does not mention it (lostFile).
+// A stop during a save leaves the old file or the new one. A file that is there but cannot be read is moved aside
+// before anything is saved: as long as it lies there, nothing may be deleted because the map does not mention it
+// (lostFile). Only a second one, found while the first still lies aside, is written over.
 #pragma once
 
 #include "daemon/base/Result.h"
@@ -19,6 +20,7 @@
 #include "store/StoreServices.h"
 #include "store/ZORGlobalConfiguration.h"
 
+#include <atomic>
 #include <optional>
 #include <set>
 #include <string>
@@ -88,7 +90,9 @@ public:
 private:
     [[nodiscard]] plist::Dictionary _readEntitlementMappingFromDisk();
     Result<void> _writeEntitlementMappingToDisk() ZOR_REQUIRES(entitlementQueue_);
-    void moveUnreadableFileAside();
+    /// An error, not logged, when it could not be moved. One that lies aside already lets this one stay.
+    Result<void> moveUnreadableFileAside();
+    [[nodiscard]] bool unreadFileIsInPlace();
 
     /// A group entitlement as a list without repetitions; what is neither an array of strings nor a string is said and
     /// ignored. `entitlements` may be nullptr.
@@ -148,6 +152,9 @@ private:
     ZORGlobalConfiguration& configuration_;
     StoreServices& services_;
     const FileURL entitlementMappingFileUrl_;
+    const FileURL unreadableFileUrl_;
+    /// The file that could not be read had its name still when that was last looked at. Set while the map is loaded.
+    std::atomic<bool> fileIsUnread_{false};
     platform::Mutex entitlementQueue_;
     plist::Dictionary entitlementMappingDict_ ZOR_GUARDED_BY(entitlementQueue_);
     /// The last save failed: the map is ahead of the file, and no change may be answered with success before one

@@ -261,8 +261,38 @@ TEST(EntitlementMapping, AnUnreadableFileIsKeptAside) {
     world.load();
     EXPECT_EQ(world.read(aside), "first loss");
     EXPECT_EQ(world.read(file), "second loss");
+    // Who accepts the first loss has not seen the second.
+    ASSERT_EQ(::unlink(world.path(aside).c_str()), 0);
+    EXPECT_EQ(world.services().entitlements().lostFile(), FileURL::file(world.path(file)));
+    ASSERT_TRUE(world.services().entitlements()._setEntitlementDictionaryValues({Dictionary{{"k", 1}}}, {"b"}));
+    EXPECT_EQ(world.read(aside), "second loss");
     ASSERT_EQ(::unlink(world.path(aside).c_str()), 0);
     EXPECT_FALSE(world.services().entitlements().lostFile());
+}
+
+// Goal: a file that could be neither read nor moved aside is lost all the same, and nothing is written over it; it goes
+// aside with the first save that can move it. Method: no rename succeeds while the map is loaded and saved once.
+TEST(EntitlementMapping, AnUnreadableFileThatCannotBeMoved) {
+    World world;
+    world.write(file, "nonsense");
+    world.disk().arm({.error = EIO, .span = support::FaultSpan::fromThenOn, .filter = [](const auto& call) {
+                          return call.call == support::DiskCall::rename &&
+                                 call.subject.find("unreadable") != std::string::npos;
+                      }});
+    ZOREntitlementMapping& mapping = world.services().entitlements();
+    const auto save = [&] { return mapping._setEntitlementDictionaryValues({Dictionary{{"k", 1}}}, {"b"}); };
+    EXPECT_EQ(mapping.lostFile(), FileURL::file(world.path(file)));
+    const auto refused = save();
+    ASSERT_FALSE(refused);
+    EXPECT_TRUE(refused.error().is(ErrorCode::entitlementFileNotWritten));
+    EXPECT_EQ(world.read(file), "nonsense");
+    EXPECT_TRUE(mapping.lostFile());
+    world.disk().disarm();
+    ASSERT_TRUE(save());
+    EXPECT_EQ(world.read(aside), "nonsense");
+    EXPECT_EQ(mapping.lostFile(), FileURL::file(world.path(aside)));
+    world.restart();
+    EXPECT_TRUE(world.services().entitlements().entitlementsExistForIdentifier("b"));
 }
 
 // Goal: queries and changes at once. Method: each thread sets and removes its own identifier and must see it.
