@@ -30,7 +30,7 @@ const plist::Value* groupIdentifiersIn(const ZORMetadata& container) {
 } // namespace
 
 std::uint64_t ZOREntitlementMapping::migrateAppGroupIdsFromDataContainersToFile() {
-    if (services_.migrator.existsMigrationFileWithName(names::groupIdMigrationMarker))
+    if (!services_.migrator.isDue(names::groupIdMigrationMarker))
         return 0;
     log_.write(logLevelNotice, migrateFunction, "Performing group ID migration");
     std::vector<ZORContainerCache::Record> containers;

@@ -33,6 +33,11 @@ std::string currentTime() {
     return text;
 }
 
+/// Of a listing: there is a link, or a file, on the way or in the directory's place.
+bool isMisshapen(const ZORError& error) {
+    return error.isPosix(ELOOP) || error.isPosix(ENOTDIR);
+}
+
 long long code(const ZORError& error) {
     return error.code();
 }
@@ -61,15 +66,19 @@ bool ZORContainerMigrator::existsMigrationFileWithName(std::string_view name) {
     return services_.fileManager.itemExistsAtURL(services_.configuration.libraryDirectory().appendingFile(name));
 }
 
+bool ZORContainerMigrator::isDue(std::string_view name) {
+    return services_.fileManager.itemDoesNotExistAtURL(services_.configuration.libraryDirectory().appendingFile(name));
+}
+
 // The bundles of an older system.
 
 ZORContainerMigrator::Outcome ZORContainerMigrator::performMigrationWithError() {
     const Log& log = services_.log;
     const FileURL former = services_.configuration.formerBundleDirectory();
     const FileURL bundles = services_.configuration.bundleDirectory();
-    if (existsMigrationFileWithName(names::bundleMigrationMarker))
+    if (!isDue(names::bundleMigrationMarker))
         return {};
-    if (services_.fileManager.itemExistsAtURL(former)) {
+    if (mayHoldBundles(former)) {
         log.write(logLevelNotice, migrationFunction, "Moving bundle containers from user to system location");
         if (auto moved = moveFormerBundles(former, bundles); !moved) {
             log.write(logLevelError, migrationFunction,
@@ -99,6 +108,16 @@ ZORContainerMigrator::Outcome ZORContainerMigrator::performMigrationWithError() 
     return {.succeeded = true, .error = std::move(count.last), .migrated = count.migrated};
 }
 
+bool ZORContainerMigrator::mayHoldBundles(const FileURL& former) {
+    if (services_.fileManager.itemExistsAtURL(former))
+        return true;
+    // What cannot be examined counts as there: its move fails, no marker is written, and the next boot tries again. A
+    // link on the way is the doing of the user who owned the place, and would keep failing.
+    struct stat status{};
+    const int failure = services_.fileManager.resolver().status(former, status);
+    return failure != ENOENT && failure != ELOOP && failure != ENOTDIR;
+}
+
 Result<void> ZORContainerMigrator::moveFormerBundles(const FileURL& former, const FileURL& bundles) {
     const auto present = TRY(services_.fileManager.urlsForItemsInDirectoryAtURL(bundles));
     // Something lies there already: an earlier migration was cut short, or containers were made before this one.
@@ -112,7 +131,8 @@ Result<void> ZORContainerMigrator::moveEachFormerBundle(const FileURL& former) {
     for (const ContainerClass containerClass : bundleClasses) {
         const FileURL source = services_.configuration.formerBundleDirectory(containerClass);
         const auto containers = services_.fileManager.urlsForItemsInDirectoryAtURL(source);
-        if (!containers && containers.error().isPosix(ENOENT))
+        // What the user put in a directory's place holds no containers; it goes with what is left.
+        if (!containers && (containers.error().isPosix(ENOENT) || isMisshapen(containers.error())))
             continue;
         if (!containers) {
             failure = containers.error();
@@ -148,7 +168,7 @@ void ZORContainerMigrator::adoptBundlesOfClass(ContainerClass containerClass, Co
                                 directory.c_str(), containers.error().text().c_str());
         // The user who owned the old place may have put anything there; a link in a class directory's place would keep
         // the class from ever having one.
-        if (containers.error().isPosix(ELOOP) || containers.error().isPosix(ENOTDIR))
+        if (isMisshapen(containers.error()))
             (void)services_.sharedClientConnection->_moveItemAtURLToDeathRow(directory, StartDeletionThread::no);
         return;
     }

@@ -34,6 +34,8 @@ public:
     void writeMigrationFileToDiskWithName(std::string_view name, const FileURL& directory);
     void writeMigrationFileToDiskWithName(std::string_view name);
     [[nodiscard]] bool existsMigrationFileWithName(std::string_view name);
+    /// Whether the marker is known not to be there: one that cannot be examined makes nothing happen a second time.
+    [[nodiscard]] bool isDue(std::string_view name);
 
     struct Outcome {
         bool succeeded = true;
@@ -46,6 +48,7 @@ public:
     Outcome performWhitelistMigrationWithError();
 
 private:
+    [[nodiscard]] bool mayHoldBundles(const FileURL& former);
     Result<void> moveFormerBundles(const FileURL& former, const FileURL& bundles);
     Result<void> moveEachFormerBundle(const FileURL& former);
     Result<void> moveFormerBundle(const FileURL& container, const FileURL& target);

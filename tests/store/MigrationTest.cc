@@ -100,19 +100,26 @@ TEST(Migration, BundlesJoinThoseThatAreThere) {
     EXPECT_TRUE(world.exists(bundleMarker));
 }
 
-// Goal: the user who owned the old place cannot use the migration to reach anything else. Method: links in the places
-// of the old location, of a class directory, of a container and of a metadata file, each to a tree that must not
-// change.
+// Goal: the user who owned the old place cannot use the migration to reach anything else, nor keep it from ending.
+// Method: links and files in the places of the old location, of what holds it, of a class directory and of a container,
+// while the new location is empty and while it is not; links lead to a tree that must not change. Then the next boot.
 TEST(Migration, BundlesOfAHostileOwner) {
     struct Row {
         const char* name;
-        const char* link;
+        const char* place;
+        bool isLink;
+        bool joins;
         bool succeeds;
     };
     const Row rows[] = {
-        {"the old location", "private/var/mobile/Containers/Bundle", false},
-        {"a class directory", "private/var/mobile/Containers/Bundle/Application", true},
-        {"a container", "private/var/mobile/Containers/Bundle/Application/11111111-0000-4000-8000-000000000000", true},
+        {"the old location", "/Bundle", true, false, false},
+        {"what holds it", "", true, false, true},
+        {"a class directory", "/Bundle/Application", true, false, true},
+        {"a container", "/Bundle/Application/11111111-0000-4000-8000-000000000000", true, false, true},
+        {"the old location, beside others", "/Bundle", true, true, true},
+        {"a class directory, beside others", "/Bundle/VPNPlugin", true, true, true},
+        {"a file for a class directory, beside others", "/Bundle/VPNPlugin", false, true, true},
+        {"a file for the old location, beside others", "/Bundle", false, true, true},
     };
     for (const Row& row : rows) {
         SCOPED_TRACE(row.name);
@@ -120,12 +127,18 @@ TEST(Migration, BundlesOfAHostileOwner) {
         putFormerBundle(world, std::string("etc/elsewhere/Application/") + firstUuid, metadataOf(1, mobile, "a"));
         const std::string file = "etc/elsewhere/Application/" + std::string(firstUuid) + "/program";
         const std::string before = world.item(file);
-        const std::string parent = std::string(row.link).substr(0, std::string(row.link).rfind('/'));
-        world.makeDirectories(parent, mobile);
-        ASSERT_EQ(::symlink(world.path("etc/elsewhere").c_str(), world.path(row.link).c_str()), 0);
-        EXPECT_EQ(migrateBundles(world).succeeded, row.succeeds);
+        if (row.joins)
+            putFormerBundle(world, bundles + "/Application/" + secondUuid, metadataOf(1, mobile, "b"));
+        const std::string place = mobileContainers + std::string(row.place);
+        world.makeDirectories(place.substr(0, place.rfind('/')), mobile);
+        if (row.isLink)
+            ASSERT_EQ(::symlink(world.path("etc/elsewhere").c_str(), world.path(place).c_str()), 0);
+        else
+            world.write(place, "x");
+        const auto outcome = migrateBundles(world);
+        EXPECT_EQ(outcome.succeeded, row.succeeds);
+        EXPECT_EQ(outcome.migrated, row.joins ? 1U : 0U);
         EXPECT_EQ(world.exists(bundleMarker), row.succeeds);
-        EXPECT_EQ(world.item(file), before);
         // A class directory can be had afterwards.
         const std::string identifier = "com.example.new";
         EXPECT_EQ(world.daemonsClient()
@@ -133,7 +146,23 @@ TEST(Migration, BundlesOfAHostileOwner) {
                                                       {.createIfNecessary = true})
                       .has_value(),
                   true);
+        world.restart();
+        EXPECT_TRUE(migrateBundles(world).succeeded);
+        EXPECT_TRUE(world.exists(bundleMarker));
+        EXPECT_EQ(world.item(file), before);
     }
+}
+
+// Goal: the migration that believes the mobile user's metadata files is not made a second time because its marker
+// cannot be examined. Method: a link in the place of the directory that holds the marker.
+TEST(Migration, AMarkerThatCannotBeExamined) {
+    World world;
+    world.makeDirectories("elsewhere");
+    world.makeDirectories("private/var/root/Library");
+    ASSERT_EQ(::symlink(world.path("elsewhere").c_str(), world.path(library).c_str()), 0);
+    putFormerBundle(world, std::string(former) + "/Application/" + firstUuid, metadataOf(1, mobile, "a"));
+    EXPECT_EQ(migrateBundles(world).migrated, 0U);
+    EXPECT_TRUE(world.exists(std::string(former) + "/Application/" + firstUuid));
 }
 
 // Goal: each failure of the bundle migration has its words and its end: no marker where it must come again. Method: a
