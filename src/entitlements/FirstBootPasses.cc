@@ -64,6 +64,14 @@ std::uint64_t ZOREntitlementMapping::migrateAppGroupIdsFromDataContainersToFile(
     return migrated;
 }
 
+bool ZOREntitlementMapping::groupIdsAreMigrated() {
+    if (services_.migrator.existsMigrationFileWithName(names::groupIdMigrationMarker))
+        return true;
+    // Where that user is not, the lists can never be fetched, and there is never a marker.
+    ZORPerUserConfiguration* user = configuration_.getPerUserConfigurationForUserId(firstMobileUserId);
+    return user && user->isKnownToHaveNoHome();
+}
+
 bool ZOREntitlementMapping::migrateGroupIdentifiers(const ZORMetadata& container) {
     const std::string& identifier = container.identifier();
     const plist::Value groups = *groupIdentifiersIn(container);

@@ -80,6 +80,9 @@ public:
     // over. Both give the number of containers that they changed.
     /// Moves the group identifiers that older systems kept in data containers into the map; once for the device.
     std::uint64_t migrateAppGroupIdsFromDataContainersToFile() ZOR_EXCLUDES(entitlementQueue_);
+    /// Whether that has been done, or there is nobody for whom it would have to be. As long as not, groups may be in
+    /// use that the map does not mention. Asked of the disk each time; enters no queue.
+    [[nodiscard]] bool groupIdsAreMigrated();
     /// Stages system containers that no identifier is entitled to for deletion.
     std::uint64_t reconcileSystemContainers() ZOR_EXCLUDES(entitlementQueue_);
 

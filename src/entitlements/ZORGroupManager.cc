@@ -37,6 +37,11 @@ ZORGroupManager::_copyReferenceCountSetOfType(GroupType type, const plist::Dicti
                    "%s holds entitlements that could not be read; references cannot be counted", lost->c_str());
         return std::nullopt;
     }
+    if (type == GroupType::application && !services_.entitlements.groupIdsAreMigrated()) {
+        log_.write(logLevelError, __func__,
+                   "Groups that data containers refer to have not been migrated; references cannot be counted");
+        return std::nullopt;
+    }
     return groupReferencesIn(map, type, &log_);
 }
 

@@ -51,6 +51,11 @@ std::optional<FileURL> ZORPerUserConfiguration::userHomeDirectory() {
     return userHomeDirectory_;
 }
 
+bool ZORPerUserConfiguration::isKnownToHaveNoHome() {
+    const RecursiveMutexLock held(lock_);
+    return !userHomeDirectory() && homeIsLookedUp_;
+}
+
 bool ZORPerUserConfiguration::existsUserBaseDirectory() {
     const auto home = userHomeDirectory();
     return home && fileManager_.itemExistsAtURL(*home);

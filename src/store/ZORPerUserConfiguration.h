@@ -31,6 +31,8 @@ public:
     [[nodiscard]] std::uint32_t userId() const { return userId_; }
     /// Looked up once; again where this process had no descriptors or memory left to ask with.
     [[nodiscard]] std::optional<FileURL> userHomeDirectory();
+    /// Whether the password database has answered, and names no home.
+    [[nodiscard]] bool isKnownToHaveNoHome();
     /// Whether the home exists; makes nothing.
     [[nodiscard]] bool existsUserBaseDirectory();
     std::optional<FileURL> userBaseDirectory();

@@ -64,6 +64,7 @@ inline const plist::Dictionary everything{{std::string(powers::allowed), true}};
 class Dispatch : public testing::Test {
 protected:
     Dispatch() {
+        world.write(groupMarkerPath, "");
         world.load();
         as(grant("com.example", noPowers));
         world.log.take();

@@ -35,6 +35,7 @@ const std::string noCount = "Failed to get reference count information for group
 class Processing : public testing::Test {
 protected:
     Processing() {
+        world.write(groupMarkerPath, "");
         world.log.setLevel(logLevelDebug);
         world.load();
     }

@@ -291,6 +291,47 @@ TEST(Migration, GroupIdentifiers) {
     EXPECT_TRUE(world.log.take().empty());
 }
 
+// Goal: as long as the migration of group identifiers has not ended, no application group goes because the map does not
+// mention it, at boots and at releases; then those go that nobody refers to, also where the user whose containers it is
+// about does not exist. Method: a link that keeps one list from being fetched, a boot, a release after a restart; a
+// boot without the link; a device without the user.
+TEST(Migration, GroupsStayUntilTheirIdentifiersAreMigrated) {
+    World world;
+    const std::string data = std::string(mobileContainers) + "/Data/";
+    const std::string groups = "private/var/second/Containers/Shared/AppGroup";
+    const std::string plugins = data + "VPNPlugin";
+    const std::string app = "com.example.a";
+    const std::string other = "com.example.b";
+    world.putContainer(data + "Application/" + firstUuid, metadataWithGroups(2, app, firstUuid));
+    world.putContainer(groups + "/" + firstUuid, metadataOf(7, second, "group." + app, firstUuid));
+    world.putContainer(groups + "/" + secondUuid, metadataOf(7, second, "unreferenced", secondUuid));
+    ASSERT_EQ(::symlink("/", world.path(plugins).c_str()), 0);
+    const auto boot = [&] {
+        world.restart();
+        world.daemonsClient().rebootContainerManagerSetup();
+    };
+    boot();
+    EXPECT_EQ(world.names(groups).size(), 2U);
+    EXPECT_EQ(world.log.take(3, "reconcileGroupContainersOfType"),
+              std::vector<std::string>{"Failed to get reference count information for group type: 0"});
+    world.restart();
+    ZOREntitlementMapping& mapping = world.services().entitlements();
+    const plist::Dictionary entitled{{std::string(entitlementKeys::applicationGroups), plist::Array{"group." + app}}};
+    ASSERT_EQ(mapping.processEntitlements(&entitled, &other, nullptr), ErrorCode::success);
+    ASSERT_EQ(mapping.processEntitlements(nullptr, &other, nullptr), ErrorCode::success);
+    EXPECT_EQ(world.names(groups).size(), 2U);
+    ASSERT_EQ(::unlink(world.path(plugins).c_str()), 0);
+    boot();
+    EXPECT_EQ(world.names(groups), std::vector<std::string>{firstUuid});
+
+    World without;
+    without.write("etc/passwd", "second:x:502:502::/private/var/second:/bin/sh\n");
+    without.putContainer(groups + "/" + secondUuid, metadataOf(7, second, "unreferenced", secondUuid));
+    without.restart();
+    without.daemonsClient().rebootContainerManagerSetup();
+    EXPECT_TRUE(without.names(groups).empty());
+}
+
 // Goal: exactly the system containers that nobody is entitled to go, and none when the entitlements are not known.
 // Method: three identifiers; then the same with an entitlement file that cannot be read.
 TEST(Migration, UnentitledSystemContainers) {

@@ -169,6 +169,8 @@ std::string binary(const plist::Value& value);
 
 inline constexpr const char* cachesPath = "private/var/root/Library/Caches/com.veltra.zorvaned";
 inline constexpr const char* libraryPath = "private/var/root/Library/Zorvane";
+/// On any device that has been booted: no group identifiers of an older system wait in containers.
+inline constexpr const char* groupMarkerPath = "private/var/root/Library/Zorvane/zor_group_id_migration_complete.plist";
 inline constexpr const char* sharedPath = "private/var/containers";
 inline constexpr const char* mobileContainers = "private/var/mobile/Containers";
 inline constexpr const char* mobileCaches = "private/var/mobile/Containers/Library/Caches/com.veltra.zorvaned";
