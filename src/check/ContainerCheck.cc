@@ -114,24 +114,24 @@ void ContainerCheck::checkDirectory(ClassDirectory& directory) {
                                 directory.user, CheckClassPath::yes);
     look_.forEachName(directory.descriptor, directory.url, [&](const char* name) {
         if (name[0] == '.')
-            checkHidden(directory, name);
+            checkHidden(directory.url, name);
         else
             checkEntry(directory, reader, name);
     });
 }
 
-void ContainerCheck::checkHidden(const ClassDirectory& directory, const char* name) {
+void ContainerCheck::checkHidden(const FileURL& directory, const char* name) {
     // Other hidden names are nobody's business: no listing of the daemon shows them.
     if (fs::isCopyLeftover(name))
-        look_.add(FindingCode::copyLeftover, directory.url.appendingDirectory(name),
+        look_.add(FindingCode::copyLeftover, directory.appendingDirectory(name),
                   "is a copy from another file system that was cut short", Mender::boot);
 }
 
 void ContainerCheck::checkEntry(ClassDirectory& directory, const MetadataReader& reader, const char* name) {
     const FileURL url = directory.url.appendingDirectory(name);
-    const bool nameAcceptable = UUID::parse(name) ||
-                                look_.whitelist().containerIdIsWellknown(name, directory.containerClass) ||
-                                look_.whitelist().directoryNameIsWellknown(name, directory.containerClass);
+    // One that nobody can judge a boot leaves alone.
+    const bool nameAcceptable =
+        look_.whitelist().judgeName(name, directory.containerClass) != ZORWhitelist::NameOf::noContainer;
     const auto opened = openBeneath(directory.descriptor, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!opened && (opened.error() == ELOOP || opened.error() == ENOTDIR)) {
         checkMisshapen(directory, url, nameAcceptable);

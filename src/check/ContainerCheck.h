@@ -35,9 +35,11 @@ private:
         std::shared_ptr<ZORMetadata> record;
     };
 
+    /// Outside of class directories: what holds the directories that a boot moves.
+    void checkPlacesOfMoves();
     void checkClass(ContainerClass containerClass, std::uint32_t user, const std::optional<FileURL>& home);
     void checkDirectory(ClassDirectory& directory);
-    void checkHidden(const ClassDirectory& directory, const char* name);
+    void checkHidden(const FileURL& directory, const char* name);
     void checkEntry(ClassDirectory& directory, const MetadataReader& reader, const char* name);
     void checkMisshapen(const ClassDirectory& directory, const FileURL& url, bool nameAcceptable);
     /// False when there is no record that its class directory's owner would be given.

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "entitlements/ZORWhitelist.h"
 
+#include "daemon/base/UUID.h"
 #include "fs/DictionaryFile.h"
 #include "fs/OwnedFile.h"
 #include "platform/linux/Names.h"
@@ -33,22 +34,31 @@ ZORWhitelist::Mapping builtInSystemGroups() {
     return mapping;
 }
 
-ZORWhitelist::Mapping mappingIn(const plist::Dictionary& file, std::string_view key, const Log& log) {
-    ZORWhitelist::Mapping mapping;
-    const plist::Dictionary* table = file.dictionary(key);
-    if (!table)
-        return mapping;
-    for (const auto& [identifier, value] : *table) {
-        const std::string* name = value.asString();
-        const bool taken = name && std::ranges::any_of(mapping, [&](const auto& row) { return row.second == *name; });
-        if (!name || !isDirectoryName(*name) || taken)
-            log.write(logLevelError, "ZORWhitelist",
-                      "Well-known container %s has no usable directory name of its own (%s); ignoring it",
-                      ZOR_SHOWN(identifier), plist::describe(&value).c_str());
-        else
-            mapping.emplace(identifier, *name);
+ZORWhitelist::Table tableIn(const plist::Dictionary& file, std::string_view key, const Log& log) {
+    constexpr const char* function = "ZORWhitelist";
+    ZORWhitelist::Table table;
+    const plist::Value* value = file.find(key);
+    const plist::Dictionary* rows = value ? value->asDictionary() : nullptr;
+    if (value && !rows) {
+        const std::string shown(key);
+        log.write(logLevelError, function, "Well-known containers under %s are no dictionary; ignoring them",
+                  shown.c_str());
+        table.isWhole = false;
     }
-    return mapping;
+    for (const auto& [identifier, row] : rows ? *rows : plist::Dictionary()) {
+        const std::string* name = row.asString();
+        const bool taken =
+            name && std::ranges::any_of(table.rows, [&](const auto& other) { return other.second == *name; });
+        if (name && isDirectoryName(*name) && !taken) {
+            table.rows.emplace(identifier, *name);
+            continue;
+        }
+        log.write(logLevelError, function,
+                  "Well-known container %s has no usable directory name of its own (%s); ignoring it",
+                  ZOR_SHOWN(identifier), plist::describe(&row).c_str());
+        table.isWhole = false;
+    }
+    return table;
 }
 
 } // namespace
@@ -57,26 +67,28 @@ ZORWhitelist ZORWhitelist::forSystem(const Log& log, ZORFileManager& fileManager
     const FileURL url = FileURL::file(fileManager.resolver().root().path(platform::names::wellKnownTable));
     const auto file = readDictionaryAtURL(url, fs::metadataFileBytesMax, fileManager);
     if (file)
-        return {mappingIn(*file, systemKey, log), mappingIn(*file, systemGroupKey, log)};
-    if (!file.error().isPosix(ENOENT))
+        return {tableIn(*file, systemKey, log), tableIn(*file, systemGroupKey, log)};
+    const bool isThere = !file.error().isPosix(ENOENT);
+    if (isThere)
         log.write(logLevelError, __func__, "The table of well-known containers is not used: %s",
                   file.error().text().c_str());
-    return {builtInSystemContainers(), builtInSystemGroups()};
+    return {{.rows = builtInSystemContainers(), .isWhole = !isThere},
+            {.rows = builtInSystemGroups(), .isWhole = !isThere}};
 }
 
-const ZORWhitelist::Mapping* ZORWhitelist::tableOf(ContainerClass containerClass) const {
+const ZORWhitelist::Table* ZORWhitelist::tableOf(ContainerClass containerClass) const {
     if (containerClass == ContainerClass::sharedSystemGroup)
-        return &systemGroupWhitelist_;
-    return containerClass == ContainerClass::dataSystem ? &systemWhitelist_ : nullptr;
+        return &systemGroup_;
+    return containerClass == ContainerClass::dataSystem ? &system_ : nullptr;
 }
 
 const std::string* ZORWhitelist::wellknownContainerForId(std::string_view identifier,
                                                          ContainerClass containerClass) const {
-    const Mapping* table = tableOf(containerClass);
+    const Table* table = tableOf(containerClass);
     if (!table)
         return nullptr;
-    const auto row = table->find(identifier);
-    return row == table->end() ? nullptr : &row->second;
+    const auto row = table->rows.find(identifier);
+    return row == table->rows.end() ? nullptr : &row->second;
 }
 
 const std::string* ZORWhitelist::wellknownSystemContainerForId(std::string_view identifier) const {
@@ -100,20 +112,34 @@ bool ZORWhitelist::containerIdIsWellknown(std::string_view identifier, Container
 }
 
 bool ZORWhitelist::directoryNameIsWellknown(std::string_view name, ContainerClass containerClass) const {
-    const Mapping* table = tableOf(containerClass);
-    return table && std::ranges::any_of(*table, [&](const auto& row) { return row.second == name; });
+    const Table* table = tableOf(containerClass);
+    return table && std::ranges::any_of(table->rows, [&](const auto& row) { return row.second == name; });
+}
+
+bool ZORWhitelist::isWhole(ContainerClass containerClass) const {
+    const Table* table = tableOf(containerClass);
+    return !table || table->isWhole;
+}
+
+ZORWhitelist::NameOf ZORWhitelist::judgeName(std::string_view name, ContainerClass containerClass) const {
+    // An identifier of the table whose container goes by another name is a name all the same: what lies there is not
+    // ours to judge by a table that may have changed.
+    if (UUID::parse(name) || containerIdIsWellknown(name, containerClass) ||
+        directoryNameIsWellknown(name, containerClass))
+        return NameOf::container;
+    return isWhole(containerClass) ? NameOf::noContainer : NameOf::unknown;
 }
 
 std::vector<std::string> ZORWhitelist::wellknownSystemContainers() const {
     std::vector<std::string> identifiers;
-    for (const auto& [identifier, name] : systemWhitelist_)
+    for (const auto& [identifier, name] : system_.rows)
         identifiers.push_back(identifier);
     return identifiers;
 }
 
 std::vector<std::string> ZORWhitelist::wellknownSystemGroupContainers() const {
     std::vector<std::string> identifiers;
-    for (const auto& [identifier, name] : systemGroupWhitelist_)
+    for (const auto& [identifier, name] : systemGroup_.rows)
         identifiers.push_back(identifier);
     return identifiers;
 }

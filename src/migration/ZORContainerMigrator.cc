@@ -226,6 +226,12 @@ ZORContainerMigrator::Outcome ZORContainerMigrator::performWhitelistMigrationWit
 }
 
 bool ZORContainerMigrator::migrateWellknownOfClass(ContainerClass containerClass, Outcome& outcome) {
+    if (!services_.whitelist.isWhole(containerClass)) {
+        services_.log.write(logLevelError, whitelistFunction,
+                            "Not migrating to well-known names in %s: their table could not be read",
+                            className(containerClass));
+        return true;
+    }
     const auto classDirectory =
         services_.configuration.containerDirectoryURLForUser(systemOwnerUserId, containerClass, false);
     const auto records = services_.cache.allContainersForUser(systemOwnerUserId, containerClass, false);

@@ -92,6 +92,48 @@ TEST(Setup, Orphans) {
                       world.path(std::string("private/var/second/Containers/Shared/AppGroup/") + bareUuid)}));
 }
 
+// Goal: a table of well-known names that cannot be read whole costs no container, and moves none; one that says less
+// than it did does. Method: what may be wrong with the file, a boot over a name that only the administrator's table can
+// give, then one with a good table that gives it no more.
+TEST(Setup, ATableThatCannotBeReadDeletesNothing) {
+    const std::string table = "etc/zorvane/wellknown.plist";
+    const std::string system = shared + "/Data/System/";
+    const auto naming = [](plist::Value names) { return binary(plist::Dictionary{{"System", std::move(names)}}); };
+    struct Row {
+        const char* name;
+        std::string bytes;
+        mode_t mode;
+    };
+    const Row rows[] = {
+        {"nonsense", "x", 0644},
+        {"writable by others", naming(plist::Dictionary{{"com.veltra.other", "short-name"}}), 0664},
+        {"a row", naming(plist::Dictionary{{"com.veltra.other", "short/name"}}), 0644},
+        {"no dictionary", naming(plist::Array{"com.veltra.other"}), 0644},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.name);
+        World world;
+        const plist::Dictionary entitled{{std::string(entitlementKeys::systemContainer), true}};
+        ASSERT_TRUE(world.services().entitlements()._setEntitlementDictionaryValues(
+            {entitled, entitled}, {"com.veltra.other", "com.veltra.settingsd"}));
+        world.putContainer(system + "short-name", metadataOf(12, 499, "com.veltra.other", bareUuid));
+        world.putContainer(system + goodUuid, metadataOf(12, 499, "com.veltra.settingsd", goodUuid));
+        const auto boot = [&](const std::string& bytes, mode_t mode) {
+            world.write(table, bytes, mode);
+            world.restart();
+            world.daemonsClient().rebootContainerManagerSetup();
+        };
+        boot(row.bytes, row.mode);
+        EXPECT_EQ(world.names(shared + "/Data/System"), (std::vector<std::string>{goodUuid, "short-name"}));
+        EXPECT_EQ(world.log.take(3, cleanup),
+                  std::vector<std::string>{"Leaving " + world.path(system + "short-name") +
+                                           ": the table of well-known containers, which may name it, could not be "
+                                           "read"});
+        boot(naming(plist::Dictionary{{"com.veltra.settingsd", "settings"}}), 0644);
+        EXPECT_EQ(world.names(shared + "/Data/System"), std::vector<std::string>{"settings"});
+    }
+}
+
 TEST(Setup, AnInternalBuildShowsWhatItDeletes) {
     World world;
     world.internalBuild.internal = true;

@@ -118,12 +118,17 @@ std::uint64_t ZORClientConnection::cleanUpUsers() {
 ZORClientConnection::Orphan ZORClientConnection::orphanKind(int classDirectory, const FileURL& entry,
                                                             ContainerClass containerClass) {
     const std::string_view name = entry.lastPathComponent();
-    // An identifier of the table whose container goes by another name is a name all the same: what lies there is not
-    // ours to judge by a table that may have changed.
-    const bool acceptable = UUID::parse(name) || services_.whitelist.containerIdIsWellknown(name, containerClass) ||
-                            services_.whitelist.directoryNameIsWellknown(name, containerClass);
-    if (!acceptable)
+    switch (services_.whitelist.judgeName(name, containerClass)) {
+    case ZORWhitelist::NameOf::noContainer:
         return Orphan::byName;
+    case ZORWhitelist::NameOf::unknown:
+        services_.log.write(logLevelError, "_cleanupOrphanedDataForUser",
+                            "Leaving %s: the table of well-known containers, which may name it, could not be read",
+                            entry.c_str());
+        return Orphan::no;
+    case ZORWhitelist::NameOf::container:
+        break;
+    }
     const std::string metadata = std::string(name) + "/" + names::metadataFile;
     return services_.fileManager.itemDoesNotExistBelow(classDirectory, metadata.c_str(), entry) ? Orphan::noMetadata
                                                                                                 : Orphan::no;
