@@ -185,7 +185,8 @@ public:
     /// Removes an item, or moves it to the system's directory for temporary files. Error 4.
     Result<void> _removeItemOrMoveToTempAtURL(const FileURL& url);
 
-    // Setup (Setup.cc): before clients are served, on the thread that starts the daemon, without identifier locks.
+    // Setup (Setup.cc): before clients are served, on the thread that starts the daemon, which holds no identifier
+    // lock.
     void rebootContainerManagerSetup();
     void containerManagerSetup();
     /// How many entries went.

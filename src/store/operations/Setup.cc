@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // Bringing the store into a consistent state before any client is served: once a boot, and at every launch.
 //
-// Runs on the thread that starts the daemon, alone; only the group references take identifier locks, for their
-// deletions. Neither setup fails: what goes wrong is logged and the next step runs. Every step may be repeated, so a
-// stop anywhere is mended by the next launch: the boot's work is marked as done only when all of it ran.
+// Runs on the thread that starts the daemon, alone; only the entitlement and group passes take identifier locks, for
+// what they clear and delete. Neither setup fails: what goes wrong is logged and the next step runs. Every step may be
+// repeated, so a stop anywhere is mended by the next launch: the boot's work is marked as done only when all of it ran.
 #include "daemon/ZORClientConnection.h"
 #include "daemon/base/UserIdentity.h"
 #include "entitlements/ZOREntitlementMapping.h"
@@ -54,8 +54,9 @@ void ZORClientConnection::rebootContainerManagerSetup() {
     report.run("bundle migration", [this] { return migrateBundles(); });
     report.run("well-known migration", [this] { return migrateWellknown(); });
     report.run("shared transient containers", [this] {
-        return discardAtBoot(services_.configuration.transientDirectory(), "shared transient") +
-               discardAtBoot(services_.configuration.transientBundleDirectory(), "shared transient bundle");
+        std::uint64_t moved = discardAtBoot(services_.configuration.transientDirectory(), "shared transient");
+        moved += discardAtBoot(services_.configuration.transientBundleDirectory(), "shared transient bundle");
+        return moved;
     });
     report.run("group identifiers of data containers",
                [this] { return services_.entitlements.migrateAppGroupIdsFromDataContainersToFile(); });
