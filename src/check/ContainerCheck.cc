@@ -70,6 +70,7 @@ std::string chownCommand(const FileURL& url, mode_t mode, std::uint32_t owner, b
 } // namespace
 
 void ContainerCheck::checkAll() {
+    checkPlacesOfMoves();
     for (std::uint64_t number = 1; ipc::isContainerClass(number); ++number) {
         const ContainerClass containerClass = classes(number);
         if (isBundleClass(containerClass))
@@ -80,6 +81,19 @@ void ContainerCheck::checkAll() {
             for (const MobileUser& user : look_.users())
                 checkClass(containerClass, user.userId, user.home);
     }
+}
+
+void ContainerCheck::checkPlacesOfMoves() {
+    const StorePlaces& places = look_.device().places();
+    std::vector<FileURL> parents = {places.formerBundleDirectory().deletingLastPathComponent(),
+                                    places.sharedContainersDirectory(), places.bundleDirectory(),
+                                    places.cachesDirectory(),
+                                    places.transientBundleDirectory().deletingLastPathComponent()};
+    for (const MobileUser& user : look_.users())
+        parents.push_back(StorePlaces::userTransientDirectory(user.home).deletingLastPathComponent());
+    for (const FileURL& parent : parents)
+        if (const auto directory = look_.openDirectory(parent))
+            look_.forEachName(directory->get(), parent, [&](const char* name) { checkHidden(parent, name); });
 }
 
 void ContainerCheck::checkClass(ContainerClass containerClass, std::uint32_t user, const std::optional<FileURL>& home) {

@@ -252,6 +252,8 @@ private:
     std::uint64_t migrateBundles();
     std::uint64_t migrateWellknown();
     std::uint64_t discardAtBoot(const std::optional<FileURL>& url, const char* what);
+    /// Copies across file systems that a stop cut short: hidden, so no listing shows them.
+    void discardCopyLeftovers(const FileURL& directory);
     std::uint64_t cleanUpUsers();
     std::uint64_t sweepStaging();
     /// Names in staging that journals on the disk still speak of; nullopt when it cannot be told which there are.

@@ -68,11 +68,23 @@ TEST(Setup, Orphans) {
     }
     world.makeDirectories(system + "/short-name-without-file");
     world.makeDirectories(applications + "/.hidden");
-    world.makeDirectories(applications + "/.zorvaned-copy-abcdef");
+    // What moves across file systems hide lies beside what is moved, and beside where it goes.
+    const std::string parents[] = {applications,
+                                   shared,
+                                   shared + "/Bundle",
+                                   mobileContainers,
+                                   mobileCaches,
+                                   cachesPath,
+                                   "private/var/brevad/Library/Caches"};
+    for (const std::string& parent : parents)
+        world.makeDirectories(parent + "/.zorvaned-copy-abcdef");
     world.write(applications + "/" + "44444444-0000-4000-8000-000000000000", "a file with a good name");
     world.daemonsClient().rebootContainerManagerSetup();
-    std::multiset<std::string> gone = {"short-name-without-file", ".zorvaned-copy-abcdef", "Temp", "Temp", "Temp",
-                                       "com.veltra.zorvaned"};
+    std::multiset<std::string> gone = {"short-name-without-file", "Temp", "Temp", "Temp", "com.veltra.zorvaned"};
+    for (const std::string& parent : parents) {
+        EXPECT_FALSE(world.exists(parent + "/.zorvaned-copy-abcdef")) << parent;
+        gone.insert(".zorvaned-copy-abcdef");
+    }
     for (const Row& row : rows) {
         EXPECT_EQ(world.exists(row.directory + "/" + row.name), row.stays) << row.directory << "/" << row.name;
         if (!row.stays)

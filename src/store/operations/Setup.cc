@@ -81,6 +81,10 @@ std::uint64_t ZORClientConnection::migrateBundles() {
         services_.log.write(logLevelError, rebootFunction,
                             "Failed to migrate bundle containers to system location : %s",
                             outcome.error ? outcome.error->text().c_str() : "(null)");
+    // Where its moves hide what they copy: beside either location, and beside class directories.
+    discardCopyLeftovers(services_.configuration.formerBundleDirectory().deletingLastPathComponent());
+    discardCopyLeftovers(services_.configuration.sharedContainersDirectory());
+    discardCopyLeftovers(services_.configuration.bundleDirectory());
     return outcome.migrated;
 }
 
@@ -99,7 +103,13 @@ std::uint64_t ZORClientConnection::discardAtBoot(const std::optional<FileURL>& u
     if (!moved)
         services_.log.write(logLevelError, rebootFunction, "Failed to delete %s URL %s : %s", what, url->c_str(),
                             moved.error().text().c_str());
+    discardCopyLeftovers(url->deletingLastPathComponent());
     return moved ? 1 : 0;
+}
+
+void ZORClientConnection::discardCopyLeftovers(const FileURL& directory) {
+    for (const FileURL& leftover : services_.fileManager.copyLeftoversInDirectoryAtURL(directory))
+        (void)_moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
 }
 
 std::uint64_t ZORClientConnection::cleanUpUsers() {
@@ -178,9 +188,7 @@ std::uint64_t ZORClientConnection::_cleanupOrphanedDataForUser(std::uint32_t use
         // A failure has been logged where it happened; the next boot tries again.
         removed += _moveItemAtURLToDeathRow(entry, StartDeletionThread::no) ? 1 : 0;
     }
-    // Copies across file systems that a stop cut short: hidden, so no listing shows them.
-    for (const FileURL& leftover : services_.fileManager.copyLeftoversInDirectoryAtURL(*directory))
-        (void)_moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
+    discardCopyLeftovers(*directory);
     return removed;
 }
 
