@@ -3,6 +3,7 @@
 #include "platform/TestRoot.h"
 #include "platform/linux/LogLine.h"
 #include "platform/linux/RotatingLog.h"
+#include "plist/EscapedText.h"
 
 #include <csignal>
 #include <map>
@@ -42,7 +43,7 @@ TEST(LogLine, EscapesWhatIsNoText) {
     };
     for (const auto& [given, expected] : cases) {
         std::string line;
-        appendEscaped(line, given);
+        plist::appendEscaped(line, given);
         EXPECT_EQ(line, expected);
     }
 }
@@ -69,7 +70,7 @@ TEST(LogLine, IsCutAtItsBound) {
         EXPECT_LE(line.size(), bound);
         EXPECT_EQ(line.back(), '\n');
         std::string again;
-        appendEscaped(again, std::string_view(line).substr(0, line.size() - 1));
+        plist::appendEscaped(again, std::string_view(line).substr(0, line.size() - 1));
         EXPECT_EQ(again + "\n", line) << "a character was cut in two";
         if (bound >= whole.size()) {
             EXPECT_EQ(line, whole);

@@ -11,9 +11,10 @@ namespace zorvanerun {
 
 namespace {
 
-// Names are bytes; what is not UTF-8 is shown as a replacement character rather than ending the program.
+// Names are bytes; what is not UTF-8 is shown as a replacement character rather than ending the program. In ASCII: some
+// characters beyond it steer terminals, and programs read either form.
 std::string dumped(const nlohmann::json& document) {
-    return document.dump(2, ' ', false, nlohmann::json::error_handler_t::replace);
+    return document.dump(2, ' ', true, nlohmann::json::error_handler_t::replace);
 }
 
 nlohmann::json asJson(const Options& options, const std::vector<Mount>& mounts, const ToldContainers& told) {

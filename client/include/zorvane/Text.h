@@ -6,7 +6,8 @@
 
 namespace zorvane {
 
-/// Control characters shown as \xNN, so that a name cannot steer a terminal.
+/// Newlines shown as \n, other control characters and bytes that are no UTF-8 as \xNN, so that a name cannot steer a
+/// terminal or look like two.
 [[nodiscard]] std::string printable(const std::string& text);
 
 } // namespace zorvane

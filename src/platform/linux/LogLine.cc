@@ -1,52 +1,23 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/linux/LogLine.h"
 
-#include "plist/Utf8.h"
+#include "plist/EscapedText.h"
 
-#include <algorithm>
 #include <cstdio>
 
 namespace zor::platform {
 
+using plist::appendEscaped;
+
 namespace {
 
 constexpr std::string_view cutMark = " [cut]\n";
-constexpr std::string_view hexDigits = "0123456789abcdef";
 
 unsigned char byteAt(std::string_view text, std::size_t position) {
     return static_cast<unsigned char>(text[position]);
 }
 
-/// U+0080 to U+009F steer terminals like the ones below U+0020 do.
-bool isControl(char32_t character) {
-    return (character < 0x20 && character != '\t') || (character >= 0x7F && character < 0xA0);
-}
-
-void appendHex(std::string& line, unsigned char byte) {
-    line += "\\x";
-    line += hexDigits[byte >> 4];
-    line += hexDigits[byte & 0xF];
-}
-
 } // namespace
-
-void appendEscaped(std::string& line, std::string_view text) {
-    for (std::size_t i = 0; i < text.size();) {
-        const plist::Utf8Character character = plist::decodeUtf8(text.substr(i));
-        if (character.length > 0 && !isControl(character.codePoint)) {
-            line.append(text, i, character.length);
-            i += character.length;
-            continue;
-        }
-        const std::size_t end = i + std::max<std::size_t>(character.length, 1);
-        for (; i < end; ++i) {
-            if (text[i] == '\n')
-                line += "\\n";
-            else
-                appendHex(line, byteAt(text, i));
-        }
-    }
-}
 
 std::string formatLogLine(const LogEvent& event, std::size_t bytesMax) {
     tm calendar{};

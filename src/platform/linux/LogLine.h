@@ -24,7 +24,4 @@ struct LogEvent {
 /// so.
 [[nodiscard]] std::string formatLogLine(const LogEvent& event, std::size_t bytesMax);
 
-/// Appends `text`: newlines as \n, other control characters (a tab is left) and bytes that are no UTF-8 as \xNN.
-void appendEscaped(std::string& line, std::string_view text);
-
 } // namespace zor::platform

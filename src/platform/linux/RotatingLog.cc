@@ -3,6 +3,7 @@
 
 #include "platform/Format.h"
 #include "platform/linux/LogLine.h"
+#include "plist/EscapedText.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -73,7 +74,7 @@ void RotatingLog::write(int level, std::string_view function, std::string_view m
 
 void RotatingLog::writeToSystemLog(int priority, std::string_view message) {
     std::string text;
-    appendEscaped(text, message.substr(0, lineBytesMax));
+    plist::appendEscaped(text, message.substr(0, lineBytesMax));
     ::syslog(LOG_DAEMON | LOG_PRI(priority), "%s", text.c_str());
     if (foreground_ == Foreground::yes) {
         const MutexLock lock(mutex_);
