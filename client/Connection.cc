@@ -26,6 +26,12 @@ std::unexpected<Error> fail(Error::Kind kind, std::string message) {
     return std::unexpected(Error{.kind = kind, .code = 0, .message = std::move(message)});
 }
 
+/// The same whether a request met the end or the wait for its reply did: why the daemon hung up it cannot say any more.
+std::unexpected<Error> ended() {
+    return fail(Error::Kind::refused, "zorvaned ended the connection without an answer: this program is not known to "
+                                      "it, or may not send the command, or the daemon stopped");
+}
+
 std::string withReason(const std::string& what, int number) {
     const char* reason = strerrordesc_np(number);
     return what + ": " + (reason ? reason : "unknown error");
@@ -110,7 +116,7 @@ Result<std::uint64_t> Client::Connection::send(const plist::Dictionary& request)
         if (count < 0 && (errno == EINTR || errno == EAGAIN))
             continue;
         if (count < 0)
-            return fail(Error::Kind::refused, "zorvaned ended the connection: this program may not send the command");
+            return ended();
         sent += static_cast<std::size_t>(count);
     }
     return header.id;
@@ -124,8 +130,7 @@ Result<void> Client::Connection::readAll(std::uint8_t* bytes, std::size_t count)
         if (got < 0 && errno == EINTR)
             continue;
         if (got <= 0)
-            return fail(Error::Kind::refused, "zorvaned ended the connection without an answer: this program is not "
-                                              "known to it, or may not send the command, or the daemon stopped");
+            return ended();
         have += static_cast<std::size_t>(got);
     }
     return {};

@@ -6,6 +6,7 @@
 #include "ipc/Uuid.h"
 #include "platform/FileDescriptor.h"
 #include "plist/Binary.h"
+#include "zorvane/Text.h"
 
 #include <gtest/gtest.h>
 
@@ -279,9 +280,32 @@ TEST(Client, NobodyThere) {
     expectUnreachable(nothing.options());
     ScriptedDaemon gone;
     gone.serve([](int, std::uint64_t) {});
-    ASSERT_TRUE(Client::connect(gone.options()));
+    auto client = Client::connect(gone.options());
+    ASSERT_TRUE(client);
+    // Hung up upon while it waits, and then before it has sent all: why is not known in either case.
+    for (int call = 0; call < 2; ++call) {
+        const auto done = client->emptyDeathRow();
+        ASSERT_FALSE(done);
+        EXPECT_EQ(done.error().kind, Kind::refused);
+        EXPECT_NE(done.error().message.find("or the daemon stopped"), std::string::npos) << done.error().message;
+    }
     gone.leaveSocketBehind();
     expectUnreachable(gone.options());
+}
+
+// Goal: a name can neither steer a terminal nor move a column. Method: what a log line leaves, or used to be left here.
+TEST(Client, NamesAreMadePrintable) {
+    for (const auto& [name, shown] : std::initializer_list<std::pair<std::string, std::string>>{
+             {"caf\xc3\xa9", "caf\xc3\xa9"},
+             {"\xc2\x9b"
+              "31m",
+              "\\xc2\\x9b31m"},
+             {"\x9b"
+              "31m",
+              "\\x9b31m"},
+             {"two\nlines\tand\x1b", "two\\nlines\\x09and\\x1b"},
+         })
+        EXPECT_EQ(printable(name), shown);
 }
 
 TEST(Client, RootsOfAnyLength) {
