@@ -3,6 +3,7 @@
 
 #include "daemon/base/UserIdentity.h"
 #include "fs/BulkDirectoryRead.h"
+#include "platform/linux/Names.h"
 #include "store/Names.h"
 #include "store/ZORPerUserConfiguration.h"
 
@@ -13,11 +14,19 @@ namespace zor::check {
 
 Look::Look(CheckedSystem& system, const CheckOptions& options)
     : system_(system), options_(options), whitelist_(ZORWhitelist::forSystem(system.log(), system.fileManager())) {
-    for (std::uint32_t userId = firstMobileUserId; userId <= lastMobileUserId; ++userId) {
-        auto home = ZORPerUserConfiguration::homeOf(system.passwords(), userId);
-        if (home && system.fileManager().itemExistsAtURL(*home))
-            users_.push_back({userId, std::move(*home)});
-    }
+    for (std::uint32_t userId = firstMobileUserId; userId <= lastMobileUserId; ++userId)
+        addUser(userId);
+}
+
+void Look::addUser(std::uint32_t userId) {
+    auto home = ZORPerUserConfiguration::homeOf(system_.passwords(), userId);
+    const FileURL looked = home ? *home : FileURL::file(system_.root().path(platform::names::passwordFile));
+    struct stat status{};
+    const int error = home ? system_.fileManager().resolver().status(*home, status) : home.error();
+    if (error == 0)
+        users_.push_back({userId, std::move(*home)});
+    else if (error != ENOENT)
+        addUnexamined(looked, error).user = userId;
 }
 
 Finding& Look::add(FindingCode code, const FileURL& url, std::string what, Mender mender) {
@@ -35,9 +44,9 @@ Finding& Look::addForPerson(FindingCode code, const FileURL& url, std::string wh
     return finding;
 }
 
-void Look::addUnexamined(const FileURL& url, int error) {
-    addForPerson(FindingCode::unexamined, url, std::string("cannot be looked at: ") + errorText(error),
-                 "ls -ld " + shellQuoted(url.path()));
+Finding& Look::addUnexamined(const FileURL& url, int error) {
+    return addForPerson(FindingCode::unexamined, url, std::string("cannot be looked at: ") + errorText(error),
+                        "ls -ld " + shellQuoted(url.path()));
 }
 
 void Look::addWrongShape(const FileURL& url) {
@@ -81,10 +90,12 @@ void Look::forEachName(int directory, const FileURL& url, const std::function<vo
 }
 
 std::string Look::moveAside(const FileURL& url) const {
+    const FileURL parent = url.deletingLastPathComponent();
+    const std::string name(url.lastPathComponent());
     const std::string aside =
-        system_.root().path(names::rootHome) + "/" + std::string(url.lastPathComponent()) + ".aside";
-    return inDirectory(url.deletingLastPathComponent().path(),
-                       "mv -nT -- " + shellQuoted(url.lastPathComponent()) + " " + shellQuoted(aside));
+        system_.root().path(names::rootHome) + "/" + std::string(parent.lastPathComponent()) + "-" + name + ".aside";
+    // What lies there from before gets a number: -n would move nothing, and call that done.
+    return inDirectory(parent.path(), "mv --backup=numbered -T -- " + shellQuoted(name) + " " + shellQuoted(aside));
 }
 
 } // namespace zor::check

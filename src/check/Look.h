@@ -33,14 +33,14 @@ public:
     [[nodiscard]] CheckedSystem& device() { return system_; }
     [[nodiscard]] const CheckOptions& options() const { return options_; }
     [[nodiscard]] const ZORWhitelist& whitelist() const { return whitelist_; }
-    /// Those that have a home.
+    /// Those that have a home, so far as it can be looked at.
     [[nodiscard]] const std::vector<MobileUser>& users() const { return users_; }
 
     /// Adds a finding and gives it for more to be filled in. `url` is what it is about.
     Finding& add(FindingCode code, const FileURL& url, std::string what, Mender mender);
     /// A finding that somebody who may use a shell can mend.
     Finding& addForPerson(FindingCode code, const FileURL& url, std::string what, std::string command);
-    void addUnexamined(const FileURL& url, int error);
+    Finding& addUnexamined(const FileURL& url, int error);
 
     /// An open directory; nothing when there is none, or when there is something else, which is then a finding.
     [[nodiscard]] std::optional<platform::FileDescriptor> openDirectory(const FileURL& url);
@@ -56,6 +56,7 @@ public:
     [[nodiscard]] std::vector<Finding> take() { return std::move(findings_); }
 
 private:
+    void addUser(std::uint32_t userId);
     void addWrongShape(const FileURL& url);
 
     CheckedSystem& system_;

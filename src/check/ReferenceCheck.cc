@@ -24,8 +24,9 @@ std::optional<plist::Dictionary> ReferenceCheck::readMap() {
     const FileURL aside = look_.device().places().unreadableEntitlementFile();
     const bool lost = !fileManager.itemDoesNotExistAtURL(aside);
     if (lost)
+        // No command removes it: that accepts the loss, and what was lost has to be registered before.
         look_.addForPerson(FindingCode::entitlementsAside, aside, "holds entitlements that could not be read",
-                           "rm -- " + shellQuoted(aside.path()));
+                           "zorvanectl explain " + std::string(pageOf(FindingCode::entitlementsAside).word));
     auto map = readEntitlementFile(file, fileManager);
     if (!map && map.error().isPosix(ENOENT))
         return lost ? std::nullopt : std::optional(plist::Dictionary());

@@ -6,7 +6,8 @@
 namespace zor::check {
 
 std::string shellQuoted(std::string_view text) {
-    // $'…' where a byte could steer a terminal; a plain quotation can hold everything else.
+    // $'…' where a byte could steer a terminal; a plain quotation can hold everything else. A shell that does not know
+    // $'…' ends it at the first quote, whatever stands before that: so there is none in it.
     bool plain = true;
     for (const char c : text)
         plain = plain && static_cast<unsigned char>(c) >= 0x20 && static_cast<unsigned char>(c) < 0x7F;
@@ -15,9 +16,7 @@ std::string shellQuoted(std::string_view text) {
         const auto byte = static_cast<unsigned char>(c);
         if (plain)
             quoted += c == '\'' ? std::string("'\\''") : std::string(1, c);
-        else if (c == '\'' || c == '\\')
-            quoted += std::string("\\") + c;
-        else if (byte >= 0x20 && byte < 0x7F)
+        else if (byte >= 0x20 && byte < 0x7F && c != '\'' && c != '\\')
             quoted += c;
         else
             quoted += formatted("\\%03o", static_cast<unsigned>(byte));

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "check/StoreCheck.h"
 #include "check/Repair.h"
+#include "check/ShellText.h"
 #include "entitlements/EntitlementFile.h"
 #include "support/FileTree.h"
 #include "world/World.h"
@@ -230,6 +231,12 @@ const std::vector<Damage>& damages() {
         {"lost entitlements",
          [](Store& s) { s.world.write(std::string(test::libraryPath) + "/" + names::unreadableEntitlementFile, "x"); },
          entitlementsAside, Mender::person, ".unreadable"},
+        {"a home that cannot be looked at",
+         [](Store& s) {
+             std::ofstream(s.world.path("etc/passwd"), std::ios::app)
+                 << "third:x:504:504::/private/var/" + std::string(300, 'n') + ":/bin/sh\n";
+         },
+         unexamined, Mender::person, "nnn"},
         {"somebody's boot marker", [](Store& s) { s.world.bootMarker.state = {.present = false, .foreign = true}; },
          bootMarkerForeign, Mender::launch, "sem.marker"},
     };
@@ -254,6 +261,7 @@ TEST(StoreCheckTest, FindsEachDamageAndChangesNothing) {
         EXPECT_EQ(finding.rule, damage.rule);
         EXPECT_TRUE(finding.path.ends_with(damage.path)) << finding.path;
         EXPECT_EQ(finding.command.empty(), damage.mender != Mender::person) << finding.command;
+        EXPECT_FALSE(finding.command.starts_with("rm ")) << finding.command;
         EXPECT_FALSE(isWhole(findings));
         EXPECT_EQ(repairSteps(findings, "/").size(), 1U);
     }
@@ -343,10 +351,51 @@ TEST(StoreCheckTest, MakesOneStepForEachContainer) {
     ASSERT_EQ(steps.size(), 2U);
     EXPECT_EQ(steps[0].act, RepairStep::Act::recreateStructure);
     EXPECT_EQ(steps[0].command, "zorvanectl --root '/a root' repair --class Data/Application --user 501 -- "
-                                "$'a\\'b\\012$(c)'");
+                                "$'a\\047b\\012$(c)'");
     EXPECT_EQ(steps[1].act, RepairStep::Act::emptyDeathRow);
     EXPECT_TRUE(steps[1].destroys());
     EXPECT_NE(steps[1].text.find("2 items"), std::string::npos);
+}
+
+// Goal: a name is one word of a command, whatever shell that is typed into. Method: hostile names, each as a word of a
+// command for sh and for bash; sh may know no word for a control character, but must run nothing of it.
+TEST(StoreCheckTest, NamesNeverBecomeCommands) {
+    const support::TemporaryDirectory place;
+    const std::string victim = place.path() + "/victim";
+    const std::string script = place.path() + "/script";
+    for (const std::string& name :
+         {"'; touch " + victim + " #", "'; touch " + victim + " #\x01", "\\'; touch " + victim + " #\x9b",
+          "\\\\'; touch " + victim + " #\n", "$(touch " + victim + ")\x7f", "`touch " + victim + "`\\"}) {
+        SCOPED_TRACE(name);
+        std::ofstream(script) << "printf %s " + shellQuoted(name) + " > " + place.path() + "/said\n";
+        for (const char* shell : {"sh", "bash"}) {
+            EXPECT_EQ(std::system((std::string(shell) + " " + script).c_str()), 0);
+            EXPECT_FALSE(files::exists(victim)) << shell;
+        }
+        std::ifstream said(place.path() + "/said");
+        EXPECT_EQ(std::string(std::istreambuf_iterator<char>(said), {}), name) << "as bash reads it";
+    }
+}
+
+// Goal: what is to be moved aside is, however often and from wherever something of that name was before. Method: links
+// for the same directory of two containers, twice; the commands are run.
+TEST(StoreCheckTest, MovesEverythingAside) {
+    Store store;
+    const std::string other = store.create("org.data", ContainerClass::dataApplication, 502);
+    for (int round = 0; round < 2; ++round) {
+        for (const std::string& container : {store.data, other}) {
+            files::remove_all(container + "/Library");
+            files::create_symlink("/", container + "/Library");
+        }
+        const auto findings = store.check();
+        EXPECT_EQ(findings.size(), 2U) << textOf(findings);
+        for (const Finding& finding : findings)
+            EXPECT_EQ(std::system(finding.command.c_str()), 0) << finding.command;
+        EXPECT_FALSE(files::is_symlink(store.data + "/Library"));
+        EXPECT_FALSE(files::is_symlink(other + "/Library"));
+    }
+    const files::directory_iterator aside(store.world.path(names::rootHome));
+    EXPECT_EQ(std::ranges::count_if(aside, [](const auto& entry) { return entry.is_symlink(); }), 4);
 }
 
 } // namespace
