@@ -173,6 +173,47 @@ TEST(Run, TerminationAssertions) {
     EXPECT_EQ(contentOf(output), "started\n");
 }
 
+// Goal: what the daemon begins while a program is being made ready keeps it from starting, too; whoever waits gets the
+// container that is there then. Method: the daemon stands still while the launcher asks it; the test takes the lock.
+TEST(Run, AnAssertionTakenMeanwhile) {
+    ZOR_NEEDS_SANDBOX();
+    Launcher launcher;
+    const std::string file = launcher.daemon.path("run/zorvane/assertions/") + notes;
+    const std::string output = launcher.daemon.path("output");
+    const std::string old = launcher.data(notes);
+    files::create_directories(launcher.daemon.path("run/zorvane/assertions"));
+    for (const bool waits : {false, true}) {
+        ::kill(launcher.daemon.pid(), SIGSTOP);
+        Words words = {"--", "sh", "-c", "echo $HOME"};
+        if (waits)
+            words.insert(words.begin(), "--wait");
+        Background run(launcher.words(notes, words), output);
+        const std::string descriptors = "/proc/" + std::to_string(run.pid()) + "/fd";
+        EXPECT_TRUE(waitUntil([&] {
+            return std::ranges::any_of(files::directory_iterator(descriptors), [](const auto& entry) {
+                std::error_code error;
+                return files::read_symlink(entry, error).string().starts_with("socket:");
+            });
+        }));
+        writeFile(file, "0", 0600);
+        const int held = ::open(file.c_str(), O_RDONLY | O_CLOEXEC);
+        ASSERT_EQ(::flock(held, LOCK_EX | LOCK_NB), 0);
+        ::kill(launcher.daemon.pid(), SIGCONT);
+        if (waits) {
+            std::this_thread::sleep_for(std::chrono::milliseconds(300));
+            EXPECT_EQ(contentOf(output), "");
+            ASSERT_TRUE(launcher.daemon.client().deleteContainer(2, 501, notes, false));
+            ::unlink(file.c_str());
+            ::flock(held, LOCK_UN);
+        }
+        EXPECT_EQ(run.end(), waits ? 0 : 125);
+        ::close(held);
+    }
+    const std::string fresh = launcher.data(notes);
+    EXPECT_NE(fresh, old);
+    EXPECT_EQ(contentOf(output), fresh + "\n");
+}
+
 } // namespace
 
 // Goal: whatever keeps a program from being run is 125 and says what to do. Method: a table of command lines, the last

@@ -46,24 +46,24 @@ int tryLock(int file, int operation) {
 
 } // namespace
 
-Result<void> checkAssertion(const Root& root, const Options& options) {
+Result<Freedom> awaitFreedom(const Root& root, const Options& options) {
     const std::string name = platform::percentEncode(options.identifier);
     if (name.size() > platform::componentBytesMax)
-        return {}; // the daemon holds none on such an identifier
+        return Freedom::found; // the daemon holds none on such an identifier
     const std::string relative =
         std::string(zor::ipc::runtimeDirectory) + "/" + std::string(zor::ipc::assertionDirectory) + "/" + name;
     // Each assertion has a file of its own: behind one that ended, the next may be held already.
-    for (;;) {
+    for (Freedom freedom = Freedom::found;; freedom = Freedom::waitedFor) {
         const auto file = platform::openBeneath(root.descriptor.get(), relative.c_str(), O_RDONLY | O_NONBLOCK);
         if (!file && file.error() == ENOENT)
-            return {};
+            return freedom;
         if (!file)
             return std::unexpected(cannotLook(root.below("/" + relative), file.error()));
         int failure = tryLock(file->get(), LOCK_SH | LOCK_NB);
         if (failure == EWOULDBLOCK && options.wait)
             failure = tryLock(file->get(), LOCK_SH);
         else if (failure == 0)
-            return {}; // left by a daemon that was killed
+            return freedom; // left by a daemon that was killed
         if (failure == EWOULDBLOCK)
             return std::unexpected(Failure{
                 .what = options.identifier + " may not be started now: " + std::string(reasonIn(file->get())),

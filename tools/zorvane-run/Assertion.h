@@ -6,9 +6,12 @@
 #include "Options.h"
 #include "Root.h"
 
+#include <cstdint>
+
 namespace zorvanerun {
 
-/// Nothing when no assertion is held on the identifier. One that is held is an error, or is waited for.
-[[nodiscard]] Result<void> checkAssertion(const Root& root, const Options& options);
+enum class Freedom : std::uint8_t { found, waitedFor };
+/// Says that no assertion is held on the identifier. One that is held is an error, or is waited for.
+[[nodiscard]] Result<Freedom> awaitFreedom(const Root& root, const Options& options);
 
 } // namespace zorvanerun

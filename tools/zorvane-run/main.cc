@@ -29,6 +29,45 @@ bool hasControlCharacters(const WantedContainers& wanted, const std::string& ide
            !std::ranges::all_of(wanted.systemGroups, isPlain);
 }
 
+/// What the sandbox is made from.
+struct Prepared {
+    ToldContainers told;
+    std::vector<Mount> mounts;
+};
+
+Result<Prepared> prepare(const Root& root, const Options& options) {
+    const auto wanted = chooseContainers(options);
+    if (!wanted)
+        return std::unexpected(wanted.error());
+    if (hasControlCharacters(*wanted, options.identifier))
+        return std::unexpected(
+            Failure{.what = "an identifier holds control characters", .advice = "register groups under other names"});
+    auto told = askForContainers(root, options, *wanted);
+    if (!told)
+        return std::unexpected(told.error());
+    auto mounts = openMounts(root, options, *told);
+    if (!mounts)
+        return std::unexpected(mounts.error());
+    return Prepared{.told = std::move(*told), .mounts = std::move(*mounts)};
+}
+
+/// Looks for an assertion before anything is made, and again when all is: that may have taken minutes. Whoever waited
+/// then prepares anew, for the containers may be others by now.
+Result<int> start(const Root& root, const Options& options) {
+    if (const auto free = awaitFreedom(root, options); !free)
+        return std::unexpected(free.error());
+    for (;;) {
+        const auto prepared = prepare(root, options);
+        if (!prepared)
+            return std::unexpected(prepared.error());
+        const auto free = awaitFreedom(root, options);
+        if (!free)
+            return std::unexpected(free.error());
+        if (*free == Freedom::found)
+            return runSandboxed(options, prepared->mounts, prepared->told);
+    }
+}
+
 Result<int> run(const Options& options) {
     if (::geteuid() != 0)
         return std::unexpected(
@@ -42,23 +81,11 @@ Result<int> run(const Options& options) {
     if (!root)
         return std::unexpected(root.error());
     if (!options.dryRun)
-        if (const auto free = checkAssertion(*root, options); !free)
-            return std::unexpected(free.error());
-    const auto wanted = chooseContainers(options);
-    if (!wanted)
-        return std::unexpected(wanted.error());
-    if (hasControlCharacters(*wanted, options.identifier))
-        return std::unexpected(
-            Failure{.what = "an identifier holds control characters", .advice = "register groups under other names"});
-    const auto told = askForContainers(*root, options, *wanted);
-    if (!told)
-        return std::unexpected(told.error());
-    const auto mounts = openMounts(*root, options, *told);
-    if (!mounts)
-        return std::unexpected(mounts.error());
-    if (options.dryRun)
-        return showPlan(options, *mounts, *told);
-    return runSandboxed(options, *mounts, *told);
+        return start(*root, options);
+    const auto prepared = prepare(*root, options);
+    if (!prepared)
+        return std::unexpected(prepared.error());
+    return showPlan(options, prepared->mounts, prepared->told);
 }
 
 } // namespace
