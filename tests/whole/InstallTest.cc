@@ -3,7 +3,9 @@
 #include "archives/ArchiveMaker.h"
 #include "platform/FileDescriptor.h"
 #include "process/DaemonProcess.h"
+#include "process/Relay.h"
 
+#include <atomic>
 #include <chrono>
 #include <csignal>
 #include <cstdlib>
@@ -11,6 +13,7 @@
 #include <filesystem>
 #include <fstream>
 #include <functional>
+#include <future>
 #include <gtest/gtest.h>
 #include <set>
 #include <sys/mount.h>
@@ -50,7 +53,9 @@ std::string contentOf(const std::string& path) {
 /// The installer at work, in a process of its own.
 class Installer {
 public:
-    Installer(const DaemonProcess& daemon, const std::string& source, uid_t user = 0) {
+    Installer(const DaemonProcess& daemon, const std::string& source, uid_t user = 0)
+        : Installer(daemon.root(), source, user) {}
+    Installer(const std::string& root, const std::string& source, uid_t user = 0) {
         int ends[2];
         EXPECT_EQ(::pipe2(ends, O_CLOEXEC), 0);
         pid_ = ::fork();
@@ -60,7 +65,6 @@ public:
             if (user != 0 && (::setgid(user) != 0 || ::setuid(user) != 0))
                 ::_exit(127);
             const std::string program = programPath("zorvanectl");
-            const std::string root = daemon.root();
             ::execl(program.c_str(), "zorvanectl", "--root", root.c_str(), "--json", "install", identifier,
                     source.c_str(), "--class", user == 0 ? "1" : "2", "--yes", "--progress", "json",
                     static_cast<char*>(nullptr));
@@ -379,6 +383,59 @@ TEST(Install, OldOneDeletedMeanwhile) {
         {programPath("zorvanectl"), "--root", daemon.root(), "replace", identifier, "--class", "1", "--yes"});
     EXPECT_EQ(replaced.exitStatus, 0) << replaced.output;
     EXPECT_TRUE(std::filesystem::exists(pathOf(daemon, bundleApplication) + "/folder79/file7999"));
+}
+
+// Goal: where nobody can tell which container is live, none is thrown away. Method: the answer to the replace is lost,
+// and so is that to the next question; then the daemon answers again.
+TEST(Install, WhatMayBeTheOnlyOneIsKept) {
+    const support::TemporaryDirectory place;
+    DaemonProcess daemon;
+    daemon.start();
+    writeFile(place.path() + "/archive", makeArchive(Form::tar, {file("new")}));
+    std::atomic<bool> lost{false};
+    const Relay relay(daemon, [&](ipc::Command command) {
+        if (command == ipc::Command::replaceContainer) {
+            lost = true;
+            return Relay::Fate::hungUp;
+        }
+        return lost.exchange(false) ? Relay::Fate::hungUp : Relay::Fate::passedOn;
+    });
+    Installer installer(relay.root(), place.path() + "/archive");
+    EXPECT_EQ(installer.wait(), exitLocalError);
+    EXPECT_NE(installer.said.find("cannot be told"), std::string::npos) << installer.said;
+    EXPECT_TRUE(std::filesystem::exists(pathOf(daemon, bundleApplication, true) + "/new"));
+}
+
+// Goal: a signal ends an installation also where the daemon does not answer. Method: it is silent before the first
+// change, where one signal is to do and leaves nothing, and after the last, where a second one is.
+TEST(Install, SignalsWhileTheDaemonIsSilent) {
+    const support::TemporaryDirectory place;
+    DaemonProcess daemon;
+    daemon.start();
+    writeFile(place.path() + "/archive", makeArchive(Form::tar, {file("f")}));
+    Installer first(daemon, place.path() + "/archive");
+    ASSERT_EQ(first.wait(), 0) << first.said;
+    for (const auto& [silentAt, signals, begun] : {std::tuple(ipc::Command::getDiskUsage, 1, false),
+                                                   std::tuple(ipc::Command::recreateDefaultStructure, 5, true)}) {
+        std::promise<void> silent;
+        std::atomic<bool> told{false};
+        const Relay relay(daemon, [&, command = silentAt](ipc::Command asked) {
+            if (asked != command)
+                return Relay::Fate::passedOn;
+            if (!told.exchange(true))
+                silent.set_value();
+            return Relay::Fate::unanswered;
+        });
+        Installer installer(relay.root(), place.path() + "/archive");
+        silent.get_future().wait();
+        for (int sent = 0; sent < signals; ++sent) {
+            installer.signal(SIGINT);
+            std::this_thread::sleep_for(std::chrono::milliseconds(100));
+        }
+        EXPECT_EQ(installer.wait(), 128 + SIGINT);
+        EXPECT_EQ(installer.said.find("\"error\""), std::string::npos) << installer.said;
+        EXPECT_EQ(isGone(daemon), !begun);
+    }
 }
 
 // Goal: a disk that is too small for the new content keeps the old, and room for others. Method: a small file system.

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // The daemon's life as its users see it: killed at any moment, started twice, told to stop, asked by its tool.
 #include "process/DaemonProcess.h"
+#include "process/Relay.h"
 
 #include <atomic>
 #include <filesystem>
@@ -227,6 +228,26 @@ TEST(Tool, ExitCodesAndOutput) {
         {{"--help"}, 0, "Examples"},
         {{"--root", "/nowhere", "status"}, 3, "cannot reach zorvaned"},
         {{"--root", "/nowhere", "--json", "list", "--class", "2"}, 3, "\"unreachable\""},
+        {{"create",
+          "\xc2\x9b"
+          "31m",
+          "--class", "2"},
+         0,
+         "\\xc2\\x9b31m created"},
+        {{"--json", "list", "--class", "2"}, 0, "\"\\u009b31m\""},
+        // With --json, what the tool itself refuses is JSON too.
+        {{"--json", "wipe",
+          "\xc2\x9b"
+          "31m",
+          "--class", "2"},
+         2,
+         "{\n  \"error\""},
+        {{"--json", "info", "set", "a.b", "k", "null", "--class", "2"}, 2, "{\n  \"error\""},
+        {{"--json", "entitlements", "set", "a.b"}, 2, "{\n  \"error\""},
+        {{"--json", "entitlements", "set", "a.b", "--from", "/nowhere"}, 2, "{\n  \"error\""},
+        {{"--json", "explain", "10000"}, 2, "{\n  \"error\""},
+        {{"--root", "/", "--json", "lock-state", "1"}, 2, "{\n  \"error\""},
+        {{"lookup", "--class", "--json"}, 2, "{\n  \"error\""},
     };
     for (const ToolCall& row : rows)
         expectCall(root, row);
@@ -269,6 +290,19 @@ TEST(Life, KilledWhileAChangeOfProtectionWaits) {
     expectCall(root, {show, 0, "\"recorded\": 1"});
 }
 
+// Goal: a size that cannot be told is not told as none, and its question costs no other. Method: no answer to it.
+TEST(Tool, SaysWhatItCouldNotMeasure) {
+    DaemonProcess daemon;
+    daemon.start();
+    const Relay relay(daemon, [](ipc::Command command) {
+        return command == ipc::Command::getDiskUsage ? Relay::Fate::unanswered : Relay::Fate::passedOn;
+    });
+    const std::string root = relay.root();
+    expectCall(root, {{"create", "a.b", "--class", "2"}, 0, "created"});
+    expectCall(root, {{"--timeout", "1000", "wipe", "a.b", "--class", "2"}, 2, "an unknown number of bytes"});
+    expectCall(root, {{"--timeout", "1000", "--json", "delete", "a.b", "--class", "2", "--yes"}, 0, "\"bytes\": null"});
+}
+
 // Goal: damage is found, told and mended as promised, with a daemon and without one. Method: a table of calls over a
 // store whose container lost a directory, then over one whose daemon was killed.
 TEST(Tool, ChecksAndRepairs) {
@@ -290,7 +324,7 @@ TEST(Tool, ChecksAndRepairs) {
     EXPECT_TRUE(std::filesystem::exists(documents));
     expectCall(root, {{"explain", "subdirectory-missing"}, 0, "Consequence"});
     expectCall(root, {{"check", "--dry-run"}, 2, "--repair"});
-    expectCall(root, {{"--root", "/nowhere", "--json", "check"}, 3, "\"unreachable\""});
+    expectCall(root, {{"--root", "/nowhere", "--json", "check"}, 5, "\"local\""});
     daemon.kill();
     expectCall(root, {{"check"}, 0, "The store is whole"});
     std::filesystem::remove(documents);

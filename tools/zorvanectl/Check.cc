@@ -179,10 +179,12 @@ private:
 } // namespace
 
 int check(const zorvane::ConnectOptions& connect, const Output& output, const Checking& checking, Consent consent) {
+    const std::string what = "check " + connect.root;
     const auto system = CheckedSystem::open(connect.root);
     if (!system)
-        return output.error(
-            {.kind = zorvane::Error::Kind::unreachable, .code = 0, .message = printable(system.error())}, "check");
+        return output.localError(exitLocalError, printable(system.error()),
+                                 "run it as the user that the daemon runs as, and name the daemon's root with --root",
+                                 what);
     const CheckOptions options = optionsFor(**system, connect);
     const std::vector<Finding> findings = zor::check::checkStore(**system, options);
     if (!checking.repair)
@@ -190,7 +192,7 @@ int check(const zorvane::ConnectOptions& connect, const Output& output, const Ch
     const std::vector<RepairStep> steps = zor::check::repairSteps(findings, (*system)->root().canonicalPath());
     const auto destroying = std::ranges::find_if(steps, &RepairStep::destroys);
     if (!checking.dryRun && destroying != steps.end() && consent == Consent::ask &&
-        !output.agreed("Repair, so that " + destroying->text + "?"))
+        !output.agreed("Repair, so that " + destroying->text + "?", what))
         return exitUsage;
     Repair repair(connect, output, checking.dryRun);
     for (const RepairStep& step : steps)

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Making, finding, listing and deleting containers, and asking how the daemon is.
 #include "Commands.h"
+#include "KnownContainer.h"
 #include "RegisteredEntitlements.h"
 
 #include <algorithm>
@@ -8,10 +9,6 @@
 namespace zorvanectl {
 
 namespace {
-
-std::uint32_t userOf(const Target& target) {
-    return target.user.value_or(zorvane::defaultUserOfClass(target.containerClass));
-}
 
 std::string describe(const Target& target) {
     std::string text = target.identifier.empty() ? "this program's own container" : target.identifier;
@@ -46,9 +43,6 @@ int createOrLookup(const zorvane::ConnectOptions& connect, const Output& output,
     output.line("  path  " + printable(container->path));
     return exitDone;
 }
-
-/// The daemon's code for a container that is not there.
-constexpr std::uint64_t codeNotFound = 21;
 
 } // namespace
 
@@ -106,12 +100,10 @@ int deleteContainers(const zorvane::ConnectOptions& connect, const Output& outpu
                              .identifier = identifier,
                              .uuid = found->uuid});
     }
-    std::uint64_t bytes = 0;
-    for (const auto& deletion : deletions)
-        bytes += client->diskUsage(deletion).value_or(0);
+    const auto bytes = measured(connect, deletions);
     const std::string amount = std::to_string(deletions.size()) +
                                (deletions.size() == 1 ? " container" : " containers") + ", " + shownBytes(bytes);
-    if (consent == Consent::ask && !output.agreed("Delete " + amount + "?"))
+    if (consent == Consent::ask && !output.agreed("Delete " + amount + "?", what))
         return exitUsage;
     if (const auto staged = client->stageForDelete(deletions); !staged)
         return output.error(staged.error(), what);
@@ -122,7 +114,7 @@ int deleteContainers(const zorvane::ConnectOptions& connect, const Output& outpu
             output.line(printable(deletion.identifier) + " deleted");
     }
     if (output.isJson())
-        output.json({{"deleted", rows}, {"bytes", bytes}});
+        output.json({{"deleted", rows}, {"bytes", toJson(bytes)}});
     else
         output.line(amount);
     return exitDone;

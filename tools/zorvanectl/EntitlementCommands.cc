@@ -4,6 +4,7 @@
 #include "RegisteredEntitlements.h"
 
 #include <cstdio>
+#include <expected>
 #include <memory>
 
 namespace zorvanectl {
@@ -31,16 +32,14 @@ std::optional<std::string> contentOf(const std::string& file) {
     return std::ferror(input.get()) ? std::nullopt : std::optional(std::move(content));
 }
 
-/// The object in a file; nullopt, said on standard error, when there is none.
-std::optional<zorvane::Map> readFile(const std::string& file) {
+/// The object in a file, or why there is none.
+std::expected<zorvane::Map, std::string> readFile(const std::string& file) {
     const auto content = contentOf(file);
     const auto json = nlohmann::json::parse(content.value_or(""), nullptr, false);
     if (json.is_object())
         if (auto value = fromJson(json))
             return std::get<zorvane::Map>(std::move(value->content));
-    std::fprintf(stderr, "zorvanectl: %s %s\n", printable(file).c_str(),
-                 content ? "holds no JSON object without null" : "cannot be read");
-    return std::nullopt;
+    return std::unexpected(printable(file) + (content ? " holds no JSON object without null" : " cannot be read"));
 }
 
 void addStrings(zorvane::Map& map, const char* key, const std::vector<std::string>& texts) {
@@ -52,9 +51,13 @@ void addStrings(zorvane::Map& map, const char* key, const std::vector<std::strin
     map[key] = {std::move(list)};
 }
 
+std::string registering(const std::string& identifier) {
+    return "register " + identifier;
+}
+
 int answer(const zorvane::Result<void>& result, const Output& output, const std::string& identifier, const char* verb) {
     if (!result)
-        return output.error(result.error(), "register " + identifier);
+        return output.error(result.error(), registering(identifier));
     if (output.isJson())
         output.json({{"identifier", identifier}, {verb, true}});
     else
@@ -65,25 +68,24 @@ int answer(const zorvane::Result<void>& result, const Output& output, const std:
 } // namespace
 
 int setEntitlements(const zorvane::ConnectOptions& connect, const Output& output, const Registration& registration) {
+    const std::string what = registering(registration.identifier);
     zorvane::Map entitlements;
     if (!registration.file.empty()) {
         auto read = readFile(registration.file);
         if (!read)
-            return exitUsage;
+            return output.localError(exitUsage, read.error(), "give a file with a JSON object of entitlements", what);
         entitlements = std::move(*read);
     }
     addStrings(entitlements, applicationGroupsKey, registration.applicationGroups);
     addStrings(entitlements, systemGroupsKey, registration.systemGroups);
     if (registration.systemContainer)
         entitlements[systemContainerKey] = {true};
-    if (entitlements.empty()) {
-        std::fprintf(stderr,
-                     "zorvanectl: no entitlements given; to remove what is registered, use 'entitlements clear'\n");
-        return exitUsage;
-    }
+    if (entitlements.empty())
+        return output.localError(exitUsage, "no entitlements given",
+                                 "give some; to remove what is registered, use 'entitlements clear'", what);
     auto client = zorvane::Client::connect(connect);
     if (!client)
-        return output.error(client.error(), "register " + registration.identifier);
+        return output.error(client.error(), what);
     return answer(client->processEntitlements({.identifier = registration.identifier,
                                                .entitlements = std::move(entitlements),
                                                .parentIdentifier = registration.parent,

@@ -5,7 +5,6 @@
 #include "zorvane/Error.h"
 
 #include <algorithm>
-#include <cstdio>
 
 namespace zorvanectl {
 
@@ -63,10 +62,8 @@ int explain(const Output& output, const std::string& text) {
     if (text.empty())
         return listPages(output, pages);
     const auto page = std::ranges::find(pages, text, &Page::name);
-    if (page == pages.end()) {
-        std::fprintf(stderr, "zorvanectl: '%s' is no code; 'zorvanectl explain' lists all\n", printable(text).c_str());
-        return exitUsage;
-    }
+    if (page == pages.end())
+        return output.localError(exitUsage, "this is no code", "'zorvanectl explain' lists all", "explain " + text);
     if (output.isJson()) {
         output.json(toJson(*page));
         return exitDone;

@@ -37,28 +37,28 @@ void keepSignal(int signal) {
     receivedSignal = signal;
 }
 
-/// Signals are kept for as long as this lives; the program decides when to end.
-class SignalKeeper {
-public:
-    SignalKeeper() {
-        struct sigaction keep{};
-        keep.sa_handler = keepSignal; // without SA_RESTART: a read that waits is to end
-        for (const int signal : {SIGINT, SIGTERM, SIGHUP}) {
-            struct sigaction before{};
-            // What was ignored when this program began, as under nohup, stays so.
-            if (::sigaction(signal, nullptr, &before) == 0 && before.sa_handler != SIG_IGN)
-                ::sigaction(signal, &keep, nullptr);
-        }
-        std::signal(SIGPIPE, SIG_IGN); // who reads the progress may go; the installation goes on
+/// From here on a signal is kept, and the program decides when to end. The same one again ends it where it is: it may
+/// be waiting for a daemon that does not answer.
+void keepSignals() {
+    struct sigaction keep{};
+    keep.sa_handler = keepSignal;
+    keep.sa_flags = static_cast<int>(SA_RESETHAND); // and not SA_RESTART: a read that waits is to end
+    for (const int signal : {SIGINT, SIGTERM, SIGHUP}) {
+        struct sigaction before{};
+        // What was ignored when this program began, as under nohup, stays so.
+        if (::sigaction(signal, nullptr, &before) == 0 && before.sa_handler != SIG_IGN)
+            ::sigaction(signal, &keep, nullptr);
     }
-    /// Ends as the signal would have ended it, once everything is in order.
-    static void endBySignal() {
-        if (const int signal = receivedSignal; signal != 0) {
-            std::signal(signal, SIG_DFL);
-            ::raise(signal);
-        }
+    std::signal(SIGPIPE, SIG_IGN); // who reads the progress may go; the installation goes on
+}
+
+/// Ends as the signal would have ended it, once everything is in order.
+void endBySignal() {
+    if (const int signal = receivedSignal; signal != 0) {
+        std::signal(signal, SIG_DFL);
+        ::raise(signal);
     }
-};
+}
 
 bool canBeInstalled(std::uint64_t containerClass) {
     const std::string_view name = zorvane::containerClassName(containerClass);
@@ -90,13 +90,12 @@ private:
     const Target& target_;
     const InstallOptions& options_;
     const std::string what_;
-    const SignalKeeper signals_;
     content::Source source_;
     std::optional<Client::Address> old_;
     Client::Address fresh_;
     std::string freshPath_;
-    std::uint64_t bytesOut_ = 0;
-    std::uint64_t bytesIn_ = 0;
+    std::optional<std::uint64_t> bytesOut_ = 0;
+    std::optional<std::uint64_t> bytesIn_ = 0;
     std::uint64_t items_ = 0;
 };
 
@@ -116,18 +115,18 @@ int Installation::run(Consent consent) {
         return output_.error(old.error(), what_);
     if (old) {
         old_ = *old;
-        bytesOut_ = client->diskUsage(*old_).value_or(0);
-        const std::string question = "Replace " + shownBytes(bytesOut_) + " of " + printable(target_.identifier) + "?";
-        if (consent == Consent::ask && !output_.agreed(question))
+        bytesOut_ = measured(connect_, {&*old_, 1});
+        if (consent == Consent::ask && !output_.agreed(lossQuestion("Replace", bytesOut_, target_.identifier), what_))
             return exitUsage;
     }
     const int exitCode = install(*client);
     if (exitCode != exitDone) // what is done is not told as interrupted
-        SignalKeeper::endBySignal();
+        endBySignal();
     return exitCode;
 }
 
 int Installation::install(Client& client) {
+    keepSignals(); // before the first change, so that whatever was begun is put in order
     const auto made = client.createOrLookup({.containerClass = target_.containerClass,
                                              .user = userOf(target_),
                                              .identifier = target_.identifier,
@@ -185,7 +184,7 @@ int Installation::replace(Client& client) {
     // Standard subdirectories that the content took the place of get their owner and mode again, or come back.
     if (const auto repaired = client.recreateDefaultStructure(fresh_); !repaired)
         return failed(repaired.error().message);
-    bytesIn_ = client.diskUsage(fresh_).value_or(0);
+    bytesIn_ = measured(connect_, {&fresh_, 1});
     if (receivedSignal != 0)
         return failed("it was interrupted");
     if (const auto replaced = client.replace(old_, fresh_); !replaced)
@@ -198,8 +197,14 @@ int Installation::settle(const zorvane::Error& error) {
     auto client = Client::connect(connect_);
     const auto live = client ? client->list(target_.containerClass, userOf(target_), false)
                              : zorvane::Result<std::vector<zorvane::ListedContainer>>(std::unexpected(client.error()));
-    if (!live)
-        return failed(error.message + ". The old container or the new one is there, whole; 'zorvanectl list' tells");
+    if (!live) // the new one may be the only one left
+        return output_.localError(exitLocalError,
+                                  error.message + ". Which container is live cannot be told: " + live.error().message +
+                                      ". The new content was put together in " + printable(freshPath_) +
+                                      ", and is not thrown away",
+                                  "see with 'zorvanectl list' whether there is a container; if there is none, "
+                                  "'zorvanectl replace' puts the new one in place until the next boot",
+                                  what_);
     const auto isLive = [&](const std::array<std::uint8_t, 16>& uuid) {
         return std::ranges::find(*live, uuid, &zorvane::ListedContainer::uuid) != live->end();
     };
@@ -223,9 +228,9 @@ int Installation::done(Client& client) {
                                {"uuid", zorvane::uuidText(fresh_.uuid)},
                                {"path", path},
                                {"items", items_},
-                               {"bytesIn", bytesIn_},
+                               {"bytesIn", toJson(bytesIn_)},
                                {"replaced", old_.has_value()}};
-        json["bytesOut"] = bytesOut_;
+        json["bytesOut"] = toJson(bytesOut_);
         output_.json(json);
         return exitDone;
     }

@@ -26,4 +26,24 @@ zorvane::Result<zorvane::Client::Address> find(zorvane::Client& client, const Ta
                                     .uuid = found->uuid};
 }
 
+std::optional<std::uint64_t> measured(const zorvane::ConnectOptions& connect,
+                                      std::span<const zorvane::Client::Address> containers) {
+    auto client = zorvane::Client::connect(connect);
+    if (!client)
+        return std::nullopt;
+    std::uint64_t sum = 0;
+    for (const auto& container : containers) {
+        const auto bytes = client->diskUsage(container);
+        if (!bytes)
+            return std::nullopt;
+        sum += *bytes;
+    }
+    return sum;
+}
+
+std::string lossQuestion(const std::string& verb, const std::optional<std::uint64_t>& bytes,
+                         const std::string& identifier) {
+    return verb + " " + shownBytes(bytes) + " of " + printable(identifier) + "?";
+}
+
 } // namespace zorvanectl

@@ -4,6 +4,8 @@
 
 #include "Commands.h"
 
+#include <span>
+
 namespace zorvanectl {
 
 /// The daemon's code for a container that is not there.
@@ -14,6 +16,15 @@ inline constexpr std::uint64_t codeNotFound = 21;
 /// The address of a container. Asking for it otherwise would discard a transient one.
 [[nodiscard]] zorvane::Result<zorvane::Client::Address> find(zorvane::Client& client, const Target& target,
                                                              bool transient);
+
+/// Bytes that containers take together; nothing when that cannot be told. On a connection of its own: one whose time
+/// ran out over it would be of no more use for what follows.
+[[nodiscard]] std::optional<std::uint64_t> measured(const zorvane::ConnectOptions& connect,
+                                                    std::span<const zorvane::Client::Address> containers);
+
+/// Whether so much of an identifier's is to go for good.
+[[nodiscard]] std::string lossQuestion(const std::string& verb, const std::optional<std::uint64_t>& bytes,
+                                       const std::string& identifier);
 
 /// Connects, finds the container, and does with it what is to be done.
 template <typename Body>

@@ -26,23 +26,15 @@ int done(const zorvane::Result<void>& result, const Output& output, const std::s
     return exitDone;
 }
 
-/// What goes for good, with its size; nullopt when that is not agreed to.
-std::optional<std::uint64_t> agreedBytes(Client& client, const Client::Address& address, const Output& output,
-                                         const std::string& verb, Consent consent) {
-    const std::uint64_t bytes = client.diskUsage(address).value_or(0);
-    const std::string question = verb + " " + shownBytes(bytes) + " of " + printable(address.identifier) + "?";
-    if (consent == Consent::ask && !output.agreed(question))
-        return std::nullopt;
-    return bytes;
-}
-
 int destroyed(const zorvane::Result<void>& result, const Output& output, const std::string& what, const Target& target,
-              const char* verb, std::uint64_t bytes) {
+              const char* verb, const std::optional<std::uint64_t>& bytes) {
     if (!result)
         return output.error(result.error(), what);
     if (output.isJson())
-        output.json(
-            {{"identifier", target.identifier}, {"class", target.containerClass}, {verb, true}, {"bytes", bytes}});
+        output.json({{"identifier", target.identifier},
+                     {"class", target.containerClass},
+                     {verb, true},
+                     {"bytes", toJson(bytes)}});
     else
         output.line(printable(target.identifier) + " " + verb + ", " + shownBytes(bytes) + " went");
     return exitDone;
@@ -80,12 +72,11 @@ int replace(const zorvane::ConnectOptions& connect, const Output& output, const 
     const auto old = find(*client, target, false);
     if (!old && old.error().code != codeNotFound)
         return output.error(old.error(), what);
-    std::uint64_t bytes = 0;
+    std::optional<std::uint64_t> bytes = 0;
     if (old) {
-        const auto agreed = agreedBytes(*client, *old, output, "Replace", consent);
-        if (!agreed)
+        bytes = measured(connect, {&*old, 1});
+        if (consent == Consent::ask && !output.agreed(lossQuestion("Replace", bytes, target.identifier), what))
             return exitUsage;
-        bytes = *agreed;
     }
     return destroyed(client->replace(old ? std::optional(*old) : std::nullopt, *fresh), output, what, target,
                      "replaced", bytes);
@@ -94,11 +85,11 @@ int replace(const zorvane::ConnectOptions& connect, const Output& output, const 
 int wipe(const zorvane::ConnectOptions& connect, const Output& output, const Target& target, Consent consent) {
     const std::string what = "wipe " + named(target);
     return withContainer(connect, output, target, what, [&](Client& client, const Client::Address& address) {
-        const auto bytes = agreedBytes(client, address, output, "Wipe", consent);
-        if (!bytes)
+        const auto bytes = measured(connect, {&address, 1});
+        if (consent == Consent::ask && !output.agreed(lossQuestion("Wipe", bytes, target.identifier), what))
             return exitUsage;
         return destroyed(client.wipe(address.containerClass, address.user, address.identifier), output, what, target,
-                         "wiped", *bytes);
+                         "wiped", bytes);
     });
 }
 
@@ -217,10 +208,9 @@ int infoSet(const zorvane::ConnectOptions& connect, const Output& output, const 
     const std::string what = "set " + key + " of " + named(target);
     const auto json = nlohmann::json::parse(value, nullptr, false);
     auto parsed = json.is_discarded() ? std::optional(zorvane::Value{value}) : fromJson(json);
-    if (!parsed) {
-        std::fprintf(stderr, "zorvanectl: %s cannot be a value: null has no form there\n", printable(value).c_str());
-        return exitUsage;
-    }
+    if (!parsed)
+        return output.localError(exitUsage, printable(value) + " cannot be a value: null has no form there",
+                                 "give another value, or remove the key with 'info unset'", what);
     return withContainer(connect, output, target, what, [&](Client& client, const Client::Address& address) {
         return done(client.setInfoValue(address, key, parsed), output, what, target, "set");
     });

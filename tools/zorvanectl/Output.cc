@@ -10,9 +10,10 @@ namespace zorvanectl {
 
 namespace {
 
-// Names are bytes; what is not UTF-8 is shown as a replacement character rather than ending the program.
+// Names are bytes; what is not UTF-8 is shown as a replacement character rather than ending the program. In ASCII: some
+// characters beyond it steer terminals, and programs read either form.
 std::string dumped(const nlohmann::json& document, int indent = 2) {
-    return document.dump(indent, ' ', false, nlohmann::json::error_handler_t::replace);
+    return document.dump(indent, ' ', true, nlohmann::json::error_handler_t::replace);
 }
 
 const char* kindName(zorvane::Error::Kind kind) {
@@ -119,9 +120,9 @@ void Output::tree(const std::string& name, const zorvane::Value& value, const st
         tree(key, element, indent + "  ");
 }
 
-bool Output::agreed(const std::string& question) const {
+bool Output::agreed(const std::string& question, const std::string& while_) const {
     if (isJson() || ::isatty(STDIN_FILENO) == 0 || ::isatty(STDERR_FILENO) == 0) {
-        std::fprintf(stderr, "zorvanectl: %s Nothing was done: say --yes to have it done.\n", question.c_str());
+        (void)localError(exitUsage, question + " Nothing was done", "say --yes to have it done", while_);
         return false;
     }
     std::fprintf(stderr, "%s [y/N] ", question.c_str());
@@ -196,15 +197,21 @@ std::optional<zorvane::Value> fromJson(const nlohmann::json& json) {
     return value;
 }
 
-std::string shownBytes(std::uint64_t bytes) {
+std::string shownBytes(const std::optional<std::uint64_t>& bytes) {
+    if (!bytes)
+        return "an unknown number of bytes";
     static constexpr const char* units[] = {"bytes", "KiB", "MiB", "GiB", "TiB"};
-    auto shown = static_cast<double>(bytes);
+    auto shown = static_cast<double>(*bytes);
     std::size_t unit = 0;
     for (; shown >= 1024 && unit + 1 < std::size(units); ++unit)
         shown /= 1024;
     char text[32];
     std::snprintf(text, sizeof text, unit == 0 ? "%.0f %s" : "%.1f %s", shown, units[unit]);
     return text;
+}
+
+nlohmann::json toJson(const std::optional<std::uint64_t>& bytes) {
+    return bytes ? nlohmann::json(*bytes) : nlohmann::json();
 }
 
 nlohmann::json toJson(const zorvane::Value& value) {

@@ -37,8 +37,8 @@ public:
     void table(const std::vector<std::string>& header, const std::vector<std::vector<std::string>>& rows) const;
     /// A name and what is under it, a line each, deeper ones indented.
     void tree(const std::string& name, const zorvane::Value& value, const std::string& indent = "") const;
-    /// Asks on the terminal whether to go on. Where there is none, or for JSON, no: said on standard error.
-    [[nodiscard]] bool agreed(const std::string& question) const;
+    /// Asks on the terminal whether to go on. Where there is none, or for JSON, no: said as an error.
+    [[nodiscard]] bool agreed(const std::string& question, const std::string& while_) const;
     /// Says what failed, what that means and what to do. The exit code for it.
     [[nodiscard]] int error(const zorvane::Error& error, const std::string& while_) const;
     /// The same for what failed on this side; `exitCode` is the one for it.
@@ -50,10 +50,12 @@ private:
 };
 
 [[nodiscard]] nlohmann::json toJson(const zorvane::Value& value);
+/// null for what could not be measured.
+[[nodiscard]] nlohmann::json toJson(const std::optional<std::uint64_t>& bytes);
 /// nullopt for null, and for what holds it: the daemon's values have none.
 [[nodiscard]] std::optional<zorvane::Value> fromJson(const nlohmann::json& json);
-/// "1.4 MiB".
-[[nodiscard]] std::string shownBytes(std::uint64_t bytes);
+/// "1.4 MiB"; "an unknown number of bytes" for what could not be measured.
+[[nodiscard]] std::string shownBytes(const std::optional<std::uint64_t>& bytes);
 using zorvane::printable;
 
 } // namespace zorvanectl

@@ -11,7 +11,6 @@
 #include "platform/linux/XattrProtectionClass.h"
 
 #include <cerrno>
-#include <cstdio>
 #include <cstring>
 #include <dirent.h>
 #include <fcntl.h>
@@ -178,11 +177,9 @@ int lockState(const zorvane::ConnectOptions& connect, const Output& output, cons
     auto root = SystemRoot::open(connect.root);
     if (!root)
         return output.error(unreachable("the root " + connect.root + " cannot be opened", root.error()), what);
-    if (state && root->isDeviceRoot()) {
-        std::fputs("zorvanectl: the lock state of a device is the device's to set; name another root with --root\n",
-                   stderr);
-        return exitUsage;
-    }
+    if (state && root->isDeviceRoot())
+        return output.localError(exitUsage, "the lock state of a device is the device's to set",
+                                 "name another root with --root", what);
     const std::string directory = root->path(names::runtimeDirectory);
     if (const int failure = root->openRuntimeDirectory())
         return output.error(unreachable(directory + " cannot be opened", failure), what);

@@ -5,12 +5,15 @@
 #include "Output.h"
 
 #include <CLI/CLI.hpp>
+#include <algorithm>
 #include <functional>
 #include <unistd.h>
 
 namespace {
 
 using namespace zorvanectl;
+
+constexpr const char* jsonOption = "--json";
 
 constexpr const char* footer = R"(
 Examples:
@@ -34,7 +37,7 @@ Classes, by number, name, or the beginning of one name in lower case (data-app):
 
 Exit codes: 0 done, 1 the daemon answered with an error, 2 usage,
 3 the daemon cannot be reached or does not answer this program, 4 a check found something,
-5 something failed on this side: an archive that is refused, a full disk.)";
+5 something failed on this side: an archive that is refused, a full disk, a root that check cannot look at.)";
 
 struct Arguments {
     zorvane::ConnectOptions connect;
@@ -130,8 +133,9 @@ void addContainerCommands(CLI::App& app, Arguments& arguments, Action& action) {
     CLI::App* check = make(
         "check", "Judge the store as it lies on the disk; needs no daemon",
         [](const Arguments& a, const Output& o) { return zorvanectl::check(a.connect, o, a.checking, consentOf(a)); });
-    CLI::Option* repair =
-        check->add_flag("--repair", arguments.checking.repair, "Have the daemon put right what it can");
+    CLI::Option* repair = check->add_flag(
+        "--repair", arguments.checking.repair,
+        "Have the daemon put right what it can; asks first, for all its steps, where one of them deletes");
     check->add_flag("--dry-run", arguments.checking.dryRun, "Only say what a repair would do")->needs(repair);
     check->add_flag("-y,--yes", arguments.yes, "Do not ask");
     make("status", "Show whom the daemon takes this program for, and how it is doing",
@@ -201,7 +205,7 @@ void addInstallCommand(CLI::App& app, Arguments& arguments, Action& action) {
     command->add_option("identifier", arguments.target.identifier, "Identifier")->required();
     command
         ->add_option("source", arguments.install.source,
-                     "Archive (tar, zip, cpio, 7-Zip; compressed or not) or directory")
+                     "Archive (tar, zip, cpio, 7-Zip; compressed or not) or directory; at most 2,000,000 items")
         ->required();
     addClassAndUser(*command, arguments);
     command->add_flag("-y,--yes", arguments.yes, "Do not ask");
@@ -296,6 +300,13 @@ void addGroupCommands(CLI::App& app, Arguments& arguments, Action& action) {
     why->add_option("identifier", arguments.target.identifier, "Identifier")->required();
 }
 
+/// A command line that cannot be parsed may still say how that is to be told.
+Format formatOfUnparsed(int argumentCount, char** argumentValues) {
+    const bool json = std::any_of(argumentValues, argumentValues + argumentCount,
+                                  [](const char* word) { return std::string_view(word) == jsonOption; });
+    return json ? Format::json : Format::people;
+}
+
 } // namespace
 
 int main(int argumentCount, char** argumentValues) {
@@ -306,7 +317,7 @@ int main(int argumentCount, char** argumentValues) {
     app.add_option("--root", arguments.connect.root, "System root of the daemon")->capture_default_str();
     app.add_option("--timeout", arguments.connect.timeoutMilliseconds, "Milliseconds to wait for an answer; 0 for ever")
         ->capture_default_str();
-    app.add_flag("--json", arguments.json, "Results and errors as JSON");
+    app.add_flag(jsonOption, arguments.json, "Results and errors as JSON");
     app.require_subcommand(1);
     app.fallthrough();
     app.footer(footer);
@@ -319,7 +330,10 @@ int main(int argumentCount, char** argumentValues) {
     try {
         app.parse(argumentCount, argumentValues);
     } catch (const CLI::ParseError& error) {
-        return app.exit(error) == 0 ? exitDone : exitUsage;
+        if (error.get_exit_code() == 0) // --help is one
+            return app.exit(error);
+        return Output(formatOfUnparsed(argumentCount, argumentValues))
+            .localError(exitUsage, printable(error.what()), "see 'zorvanectl COMMAND --help'", "read the command line");
     }
     return action ? action(Output(arguments.json ? Format::json : Format::people)) : exitUsage;
 }
