@@ -8,7 +8,8 @@
 // it lies there until it is asked for again, which the next installation does, until somebody deletes the identifier's
 // transient container (zorvanectl delete --transient), or until the first launch after a boot sweeps it.
 //
-// Nobody is deleted on a guess: when a replace fails or its answer is lost, the daemon is asked what is live now.
+// Nobody is deleted on a guess: when a replace fails or its answer is lost, the daemon is asked what is live now, and
+// where it does not say, nothing is thrown away.
 #include "Commands.h"
 #include "KnownContainer.h"
 #include "ProgressDisplay.h"
