@@ -244,6 +244,20 @@ TEST(Install, DirectoryThenArchive) {
     EXPECT_EQ(shared.exitStatus, 2) << shared.output;
 }
 
+// Goal: what is said does not go into a file or socket that got a standard descriptor's number. Method: an installation
+// without any, where the third number would be the daemon's socket.
+TEST(Install, StandardDescriptorsThatAreClosed) {
+    DaemonProcess daemon;
+    daemon.start();
+    const support::TemporaryDirectory place;
+    writeFile(place.path() + "/archive", makeArchive(Form::tar, {file("f")}));
+    const auto installed = runProgram({"/bin/sh", "-c", "exec \"$@\" 0<&- 1>&- 2>&-", "sh", programPath("zorvanectl"),
+                                       "--root", daemon.root(), "install", identifier, place.path() + "/archive",
+                                       "--class", "1", "--yes", "--progress", "json"});
+    EXPECT_EQ(installed.exitStatus, 0);
+    EXPECT_EQ(daemon.counter("BrokenFrames"), 0);
+}
+
 // Goal: however an installation ends before its time, the old container is as it was, and nothing of the new one
 // stays longer than it must. Method: a table of ends, each in the middle of the installation.
 TEST(Install, WhateverFailsTheOldOneStays) {

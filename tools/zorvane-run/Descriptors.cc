@@ -22,18 +22,6 @@ bool keepOnExec(int fd) {
     return ::fcntl(fd, F_SETFD, 0) == 0;
 }
 
-bool fillStandardDescriptors() {
-    for (;;) {
-        const int fd = ::open("/dev/null", O_RDWR | O_CLOEXEC);
-        if (fd < 0)
-            return false;
-        if (fd > STDERR_FILENO)
-            return ::close(fd) == 0;
-        if (!keepOnExec(fd))
-            return false;
-    }
-}
-
 bool sendDescriptor(int socket, int fd) {
     alignas(cmsghdr) char control[CMSG_SPACE(sizeof fd)] = {};
     char byte = 0;

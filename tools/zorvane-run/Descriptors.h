@@ -9,8 +9,6 @@ namespace zorvanerun {
 /// Every descriptor from `first` on closes when a program is executed.
 [[nodiscard]] bool closeOnExecFrom(int first);
 [[nodiscard]] bool keepOnExec(int fd);
-/// Opens /dev/null in the place of each missing one of the first three, so that nothing else gets their numbers.
-[[nodiscard]] bool fillStandardDescriptors();
 
 /// One message with one descriptor on a socket of whole messages.
 [[nodiscard]] bool sendDescriptor(int socket, int fd);

@@ -12,6 +12,7 @@
 #include "Registered.h"
 #include "Supervisor.h"
 #include "Upcall.h"
+#include "platform/linux/StandardDescriptors.h"
 
 #include <algorithm>
 #include <cstdio>
@@ -74,7 +75,7 @@ Result<int> run(const Options& options) {
             Failure{.what = "this needs root: only root may ask for the containers of others, and become user " +
                             std::to_string(options.user),
                     .advice = "call it from the service manager, or with sudo"});
-    if (!fillStandardDescriptors() || !closeOnExecFrom(STDERR_FILENO + 1))
+    if (!zor::platform::fillStandardDescriptors() || !closeOnExecFrom(STDERR_FILENO + 1))
         return std::unexpected(Failure{.what = "cannot set up this process's descriptors",
                                        .advice = "use a kernel of 5.11 or newer, and mount /dev"});
     const auto root = Root::open(options.root);

@@ -3,6 +3,7 @@
 // the public client library.
 #include "Commands.h"
 #include "Output.h"
+#include "platform/linux/StandardDescriptors.h"
 
 #include <CLI/CLI.hpp>
 #include <algorithm>
@@ -335,5 +336,8 @@ int main(int argumentCount, char** argumentValues) {
         return Output(formatOfUnparsed(argumentCount, argumentValues))
             .localError(exitUsage, printable(error.what()), "see 'zorvanectl COMMAND --help'", "read the command line");
     }
-    return action ? action(Output(arguments.json ? Format::json : Format::people)) : exitUsage;
+    const Output output(arguments.json ? Format::json : Format::people);
+    if (!zor::platform::fillStandardDescriptors())
+        return output.localError(exitLocalError, "standard input, output or error is closed", "mount /dev", "starting");
+    return action ? action(output) : exitUsage;
 }
