@@ -20,29 +20,42 @@ void check(archive* made, la_int64_t result) {
         throw std::runtime_error(std::string("archive: ") + ::archive_error_string(made));
 }
 
-void setForm(archive* made, Form form) {
+int formatOf(Form form) {
     switch (form) {
     case Form::zip:
-        return check(made, ::archive_write_set_format_zip(made));
+        return ARCHIVE_FORMAT_ZIP;
     case Form::cpio:
-        return check(made, ::archive_write_set_format_cpio_newc(made));
+        return ARCHIVE_FORMAT_CPIO_SVR4_NOCRC;
     case Form::sevenZip:
-        return check(made, ::archive_write_set_format_7zip(made));
-    case Form::tarGzip:
-        check(made, ::archive_write_add_filter_gzip(made));
-        break;
-    case Form::tarZstd:
-        check(made, ::archive_write_add_filter_zstd(made));
-        break;
-    case Form::tarXz:
-        check(made, ::archive_write_add_filter_xz(made));
-        break;
+        return ARCHIVE_FORMAT_7ZIP;
     case Form::gnuTar:
-        return check(made, ::archive_write_set_format_gnutar(made));
-    case Form::tar:
-        break;
+        return ARCHIVE_FORMAT_TAR_GNUTAR;
+    default:
+        return ARCHIVE_FORMAT_TAR_PAX_RESTRICTED;
     }
-    check(made, ::archive_write_set_format_pax_restricted(made));
+}
+
+int filterOf(Form form) {
+    switch (form) {
+    case Form::tarGzip:
+        return ARCHIVE_FILTER_GZIP;
+    case Form::tarBzip2:
+        return ARCHIVE_FILTER_BZIP2;
+    case Form::tarCompress:
+        return ARCHIVE_FILTER_COMPRESS;
+    case Form::tarLz4:
+        return ARCHIVE_FILTER_LZ4;
+    case Form::tarLzip:
+        return ARCHIVE_FILTER_LZIP;
+    case Form::tarLzma:
+        return ARCHIVE_FILTER_LZMA;
+    case Form::tarXz:
+        return ARCHIVE_FILTER_XZ;
+    case Form::tarZstd:
+        return ARCHIVE_FILTER_ZSTD;
+    default:
+        return ARCHIVE_FILTER_NONE;
+    }
 }
 
 la_ssize_t append(archive* /*made*/, void* bytes, const void* buffer, std::size_t count) {
@@ -55,7 +68,8 @@ la_ssize_t append(archive* /*made*/, void* bytes, const void* buffer, std::size_
 std::string makeArchive(Form form, const std::vector<Made>& entries) {
     std::string bytes;
     const std::unique_ptr<archive, Freed> made(::archive_write_new());
-    setForm(made.get(), form);
+    check(made.get(), ::archive_write_set_format(made.get(), formatOf(form)));
+    check(made.get(), ::archive_write_add_filter(made.get(), filterOf(form)));
     ::archive_write_set_bytes_in_last_block(made.get(), 1);
     check(made.get(), ::archive_write_open(made.get(), &bytes, nullptr, append, nullptr));
     for (const Made& wanted : entries) {

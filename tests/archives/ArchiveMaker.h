@@ -20,7 +20,21 @@ struct Made {
     std::int64_t hole = 0;
 };
 
-enum class Form { tar, gnuTar, tarGzip, tarZstd, tarXz, zip, cpio, sevenZip };
+enum class Form {
+    tar,
+    gnuTar,
+    tarGzip,
+    tarBzip2,
+    tarCompress,
+    tarLz4,
+    tarLzip,
+    tarLzma,
+    tarXz,
+    tarZstd,
+    zip,
+    cpio,
+    sevenZip
+};
 
 /// The bytes. Throws std::runtime_error when the form cannot hold the entries.
 std::string makeArchive(Form form, const std::vector<Made>& entries);

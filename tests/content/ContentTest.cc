@@ -1,7 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "content/Content.h"
 #include "archives/ArchiveMaker.h"
+#include "content/Decoder.h"
 #include "content/ItemRules.h"
+#include "content/Powerless.h"
 #include "content/Unpacker.h"
 #include "platform/linux/LinuxDisk.h"
 #include "support/FaultLoop.h"
@@ -17,10 +19,16 @@
 #include <filesystem>
 #include <fstream>
 #include <memory>
+#include <set>
 #include <sstream>
+#include <sys/ioctl.h>
 #include <sys/mount.h>
+#include <sys/prctl.h>
+#include <sys/ptrace.h>
 #include <sys/socket.h>
+#include <sys/syscall.h>
 #include <sys/sysmacros.h>
+#include <sys/uio.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <thread>
@@ -225,7 +233,8 @@ TEST(Content, GoodArchives) {
         large += static_cast<char>(i * 31 >> 3);
     const std::string longName = repeated(std::string(120, 'l') + "/", 3) + "f";
     for (const Form form :
-         {Form::tar, Form::gnuTar, Form::tarGzip, Form::tarXz, Form::tarZstd, Form::zip, Form::cpio, Form::sevenZip}) {
+         {Form::tar, Form::gnuTar, Form::tarGzip, Form::tarBzip2, Form::tarCompress, Form::tarLz4, Form::tarLzip,
+          Form::tarLzma, Form::tarXz, Form::tarZstd, Form::zip, Form::cpio, Form::sevenZip}) {
         SCOPED_TRACE(static_cast<int>(form));
         const bool isTar = form != Form::zip && form != Form::cpio && form != Form::sevenZip;
         std::vector<Made> entries = {directory("."),
@@ -417,6 +426,103 @@ TEST(Content, NonsenseRecords) {
     }
 }
 
+// Goal: the process that decodes has the archive, the pipe, and nothing of its caller's. Method: one that waits for its
+// reader, as /proc shows it.
+TEST(Content, ADecoderHoldsNothing) {
+    World world;
+    writeFile(world.path("/archive"), makeArchive(Form::tar, {file("f", std::string(4'000'000, 'f'))}));
+    const FileDescriptor archive(::open(world.path("/archive").c_str(), O_RDONLY | O_CLOEXEC));
+    const auto decoder = Decoder::start(archive.get());
+    ASSERT_TRUE(decoder);
+    char record = 0;
+    ASSERT_EQ(::read(decoder->records(), &record, 1), 1); // it is ready then
+    std::string pid;
+    std::getline(std::ifstream("/proc/thread-self/children") >> std::ws, pid, ' ');
+    const std::string process = "/proc/" + pid;
+    std::set<std::string> descriptors;
+    for (const auto& entry : std::filesystem::directory_iterator(process + "/fd"))
+        descriptors.insert(entry.path().filename());
+    EXPECT_EQ(descriptors, (std::set<std::string>{"3", "4"}));
+    EXPECT_EQ(std::to_string(::getsid(std::stoi(pid))), pid) << "its caller's session, and terminal";
+    std::ostringstream status;
+    status << std::ifstream(process + "/status").rdbuf();
+    std::vector<std::string> lines = {"NoNewPrivs:\t1\n", "Seccomp:\t2\n"};
+    if (::geteuid() == 0)
+        lines.insert(lines.end(), {"Uid:\t65534\t65534\t65534\t65534\n", "CapPrm:\t0000000000000000\n"});
+    for (const std::string& line : lines)
+        EXPECT_NE(status.str().find(line), std::string::npos) << line;
+}
+
+/// A step that is not to succeed.
+struct Attempt {
+    const char* what;
+    std::function<long(pid_t parent)> call;
+};
+
+/// In a process with a terminal of its own, as an ordinary user where it can be one: starts a powerless one that makes
+/// each attempt. The number of the first that succeeded, from 1; 0 when none did.
+int firstThatSucceeds(const std::vector<Attempt>& attempts, const char* terminal) {
+    if (::setsid() < 0 || (::geteuid() == 0 && (::setgid(ownerId) != 0 || ::setuid(ownerId) != 0)))
+        return 101;
+    const int opened = ::open(terminal, O_RDWR);
+    if (opened < 0 || ::dup2(opened, 0) != 0 || ::prctl(PR_SET_DUMPABLE, 1) != 0)
+        return 102;
+    const pid_t self = ::getpid();
+    const pid_t powerless = ::fork();
+    if (powerless == 0) {
+        if (!becomePowerless(self))
+            ::_exit(103);
+        for (std::size_t i = 0; i < attempts.size(); ++i)
+            if (attempts[i].call(self) >= 0)
+                ::_exit(static_cast<int>(i) + 1);
+        ::_exit(0);
+    }
+    int status = 0;
+    ::waitpid(powerless, &status, 0);
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 104;
+}
+
+// Goal: a decoder that was taken over has no hold on anything, also where its user could do more. Method: a process
+// that gave up its powers, with a terminal and a parent of the same user, tries what could help it.
+TEST(Content, ADecoderThatWasTakenOver) {
+    const zor::support::TemporaryDirectory directory;
+    ::chmod(directory.path().c_str(), 0777);
+    const std::string own = directory.path() + "/own";
+    writeFile(own, "x");
+    (void)!::chown(own.c_str(), ownerId, ownerId);
+    const FileDescriptor master(::posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC));
+    char terminal[64];
+    ASSERT_EQ(::grantpt(master.get()), 0);
+    ASSERT_EQ(::unlockpt(master.get()), 0);
+    ASSERT_EQ(::ptsname_r(master.get(), terminal, sizeof terminal), 0);
+    ::chmod(terminal, 0666);
+    char byte = 'x';
+    iovec part{.iov_base = &byte, .iov_len = 1};
+    const char* const words[] = {"false", nullptr};
+    const std::vector<Attempt> attempts = {
+        {"types into the terminal", [&](pid_t) { return ::syscall(SYS_ioctl, 0, TIOCSTI, &byte); }},
+        {"opens", [&](pid_t) { return ::syscall(SYS_openat, AT_FDCWD, own.c_str(), O_RDONLY); }},
+        {"removes", [&](pid_t) { return ::syscall(SYS_unlinkat, AT_FDCWD, own.c_str(), 0); }},
+        {"truncates", [&](pid_t) { return ::syscall(SYS_truncate, own.c_str(), 0); }},
+        {"connects", [](pid_t) { return ::syscall(SYS_socket, AF_UNIX, SOCK_STREAM, 0); }},
+        {"signals its parent", [](pid_t parent) { return ::syscall(SYS_kill, parent, 0); }},
+        {"signals everybody", [](pid_t) { return ::syscall(SYS_kill, -1, 0); }},
+        {"writes into its parent",
+         [&](pid_t parent) { return ::syscall(SYS_process_vm_writev, parent, &part, 1, &part, 1, 0); }},
+        {"traces its parent", [](pid_t parent) { return ::syscall(SYS_ptrace, PTRACE_SEIZE, parent, 0, 0); }},
+        {"forks", [](pid_t) { return ::syscall(SYS_clone, SIGCHLD, 0, 0, 0, 0); }},
+        {"executes", [&](pid_t) { return ::syscall(SYS_execve, "/bin/false", words, words + 1); }},
+    };
+    const pid_t user = ::fork();
+    if (user == 0)
+        ::_exit(firstThatSucceeds(attempts, terminal));
+    int status = 0;
+    ASSERT_EQ(::waitpid(user, &status, 0), user);
+    ASSERT_TRUE(WIFEXITED(status));
+    const auto number = static_cast<std::size_t>(WEXITSTATUS(status));
+    EXPECT_EQ(number, 0U) << (number <= attempts.size() ? attempts[number - 1].what : "the test is not set up");
+}
+
 // Goal: a small archive cannot fill the disk, nor make items without end. Method: a file that unpacks to more than a
 // small file system may lose; a count beyond the limit.
 TEST(Content, Bombs) {
@@ -543,7 +649,7 @@ TEST(Content, OwnerWhoChangesTheContainerMeanwhile) {
         ASSERT_FALSE(world.isDamaged());
     }
     std::printf("%d came in, %d were refused\n", succeeded, refused);
-    EXPECT_GT(succeeded + refused, 20);
+    EXPECT_GT(succeeded, 0);
 }
 
 } // namespace

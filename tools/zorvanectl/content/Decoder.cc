@@ -3,6 +3,7 @@
 
 #include "ArchiveRecord.h"
 #include "GzipInput.h"
+#include "Powerless.h"
 
 #include <algorithm>
 #include <archive.h>
@@ -13,13 +14,10 @@
 #include <cstdio>
 #include <cstring>
 #include <fcntl.h>
-#include <grp.h>
 #include <initializer_list>
 #include <optional>
 #include <string>
 #include <string_view>
-#include <sys/prctl.h>
-#include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
 #include <utility>
@@ -33,38 +31,6 @@ constexpr int archiveNumber = 3;
 constexpr int recordsNumber = 4;
 constexpr std::size_t readBytes = 256 * 1024;
 constexpr int pipeBytes = 1024 * 1024;
-constexpr uid_t nobody = 65534;
-/// What a decoder may allocate: the greatest dictionaries in use take a tenth of it.
-constexpr rlim_t memoryBytesMax = rlim_t{1} << 30;
-
-#if defined(__has_feature)
-#if __has_feature(address_sanitizer) || __has_feature(thread_sanitizer)
-#define ZORVANECTL_SANITIZED
-#endif
-#endif
-#ifdef ZORVANECTL_SANITIZED
-constexpr bool limitsMemory = false; // a sanitizer has taken more address space already
-#else
-constexpr bool limitsMemory = true;
-#endif
-
-/// Cannot be taken back. The process has one thread and no more descriptors than it needs.
-bool becomePowerless(pid_t parent) {
-    if (::geteuid() == 0 && (::setgroups(0, nullptr) != 0 || ::setresgid(nobody, nobody, nobody) != 0 ||
-                             ::setresuid(nobody, nobody, nobody) != 0))
-        return false;
-    if (::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0 || ::prctl(PR_SET_PDEATHSIG, SIGKILL) != 0 ||
-        ::getppid() != parent)
-        return false;
-    const auto limit = [](auto resource, rlim_t value) {
-        const rlimit both{.rlim_cur = value, .rlim_max = value};
-        return ::setrlimit(resource, &both) == 0;
-    };
-    if (limitsMemory && !limit(RLIMIT_AS, memoryBytesMax))
-        return false;
-    // What is open stays so; nothing can be opened any more, not even in the place of what is closed.
-    return limit(RLIMIT_NOFILE, 0) && limit(RLIMIT_FSIZE, 0) && limit(RLIMIT_NPROC, 0) && limit(RLIMIT_CORE, 0);
-}
 
 /// Writes all of it, or ends the process: then nobody reads it any more.
 void send(std::string_view bytes) {
@@ -226,15 +192,22 @@ void Reading::sendData() {
     }
 }
 
-[[noreturn]] void decode(int archive, int records, pid_t parent) {
-    // A terminal sends them to both; the parent decides.
-    for (const int signal : {SIGINT, SIGTERM, SIGHUP})
-        std::signal(signal, SIG_IGN);
+/// Leaves the archive and the pipe open, under their numbers, and nothing else: the terminal, or what standard output
+/// goes to, would be the caller's.
+bool keepOnly(int archive, int records) {
     // Neither may be where the other one is to go.
     const int high = ::fcntl(records, F_DUPFD_CLOEXEC, recordsNumber + 1);
     const int highArchive = ::fcntl(archive, F_DUPFD_CLOEXEC, recordsNumber + 1);
-    if (high < 0 || highArchive < 0 || ::dup3(highArchive, archiveNumber, O_CLOEXEC) < 0 ||
-        ::dup3(high, recordsNumber, O_CLOEXEC) < 0 || ::close_range(recordsNumber + 1, ~0U, 0) != 0)
+    return high >= 0 && highArchive >= 0 && ::dup3(highArchive, archiveNumber, O_CLOEXEC) >= 0 &&
+           ::dup3(high, recordsNumber, O_CLOEXEC) >= 0 && ::close_range(0, archiveNumber - 1, 0) == 0 &&
+           ::close_range(recordsNumber + 1, ~0U, 0) == 0;
+}
+
+[[noreturn]] void decode(int archive, int records, pid_t parent) {
+    // A terminal or a service manager may send them to both; the parent decides.
+    for (const int signal : {SIGINT, SIGTERM, SIGHUP})
+        std::signal(signal, SIG_IGN);
+    if (!keepOnly(archive, records))
         ::_exit(1);
     // Names are bytes, and UTF-8 where a form of archive says what they are.
     std::setlocale(LC_CTYPE, "C.UTF-8");

@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // A process that decodes an archive and sends records (ArchiveRecord.h), for a reader that may be root.
 //
-// Archives are hostile and their decoders large. So the decoding is done where a mistake in it is worth nothing: as
-// root, the process becomes nobody; it holds the archive and the pipe, and can open, write and start nothing else. Run
-// by another user it keeps that user's right to remove and rename. It ends with its parent, and with this object.
+// Archives are hostile and their decoders large. So the decoding is done where a mistake in it is worth nothing: in a
+// process that holds the archive and the pipe and can do nothing but read the one and write to the other (Powerless.h).
+// It ends with its parent, and with this object.
 //
 // Read are tar of all dialects, zip, cpio and 7-Zip, compressed by what the library undoes itself. Forms for which it
 // would run other programs, or read other files that the archive names, are left out.
