@@ -6,6 +6,7 @@
 
 #include "fs/CopyAttributes.h"
 #include "fs/CopyData.h"
+#include "fs/FreshDirectory.h"
 #include "fs/RecursiveRemove.h"
 #include "fs/TreeWalker.h"
 #include "platform/linux/Openat2.h"
@@ -47,17 +48,6 @@ std::string linkKey(int file, const struct stat& status) {
     std::snprintf(key.data(), key.size(), "%llu-%lld-%u", static_cast<unsigned long long>(status.st_ino),
                   static_cast<long long>(extended.stx_btime.tv_sec), extended.stx_btime.tv_nsec);
     return key.data();
-}
-
-/// A new directory at the destination, which others may be able to rename at this moment: empty, ours, closed to
-/// others.
-bool isFreshDirectory(int directory) {
-    struct stat status{};
-    if (::fstat(directory, &status) != 0 || status.st_uid != ::geteuid() || (status.st_mode & 077) != 0)
-        return false;
-    std::array<std::byte, 1024> buffer;
-    BulkDirectoryRead entries(directory, buffer);
-    return entries.next() == nullptr && entries.error() == 0;
 }
 
 class Copier {

@@ -600,6 +600,34 @@ TEST(Content, EveryCallFailsAndThePowerGoes) {
     }
 }
 
+/// Puts a directory that somebody else filled where the new content's was just made.
+class SwappingDisk : public zor::support::FaultDisk {
+public:
+    using FaultDisk::FaultDisk;
+    int makeDirectory(int directory, const char* name, mode_t mode) override {
+        const int made = FaultDisk::makeDirectory(directory, name, mode);
+        if (std::string(name).starts_with(".install-")) {
+            EXPECT_EQ(::renameat2(directory, "closed", directory, name, RENAME_EXCHANGE), 0);
+        }
+        return made;
+    }
+};
+
+// Goal: what another program of root's keeps closed in the container does not come out of it. Method: its directory is
+// swapped in for the one that the installer makes, before that is opened.
+TEST(Content, AnotherDirectoryInTheWayOfTheNewContent) {
+    World world;
+    ::mkdir(world.path("/container/closed").c_str(), 0700);
+    writeFile(world.path("/container/closed/secret"), "SECRET");
+    writeFile(world.path("/archive"), makeArchive(Form::tar, {file("f")}));
+    zor::platform::LinuxDisk real(zor::platform::Syncs::off);
+    SwappingDisk disk(real);
+    const auto outcome = world.put("/archive", disk);
+    ASSERT_FALSE(outcome);
+    EXPECT_NE(outcome.error().what.find("something else in the place"), std::string::npos) << outcome.error().what;
+    EXPECT_FALSE(std::filesystem::exists(world.path("/container/secret")));
+}
+
 /// As the container's owner: moves, links and replaces what is in the container until it is killed.
 [[noreturn]] void raceAsOwner(const std::string& container) {
     if (::setgid(ownerId) != 0 || ::setuid(ownerId) != 0 || ::chdir(container.c_str()) != 0)

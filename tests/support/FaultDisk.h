@@ -42,7 +42,7 @@ struct Fault {
     [[nodiscard]] std::string describe() const;
 };
 
-class FaultDisk final : public platform::Disk {
+class FaultDisk : public platform::Disk {
 public:
     static constexpr int exitStatus = 86;
 

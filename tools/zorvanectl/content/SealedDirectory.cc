@@ -2,6 +2,7 @@
 #include "SealedDirectory.h"
 
 #include "fs/BulkDirectoryRead.h"
+#include "fs/FreshDirectory.h"
 #include "fs/RecursiveRemove.h"
 #include "platform/linux/Openat2.h"
 #include "zorvane/Text.h"
@@ -13,8 +14,6 @@
 #include <fcntl.h>
 #include <memory>
 #include <sys/random.h>
-#include <sys/stat.h>
-#include <unistd.h>
 
 namespace zorvanectl::content {
 
@@ -24,11 +23,6 @@ namespace {
 
 /// How often the owner may put something in the way of one item.
 constexpr int attemptsMax = 16;
-
-bool isOursAndClosed(int directory) {
-    struct stat status{};
-    return ::fstat(directory, &status) == 0 && status.st_uid == ::geteuid() && (status.st_mode & 077) == 0;
-}
 
 } // namespace
 
@@ -46,7 +40,7 @@ Outcome<SealedDirectory> SealedDirectory::make(zor::platform::Disk& disk, int co
     auto directory = zor::platform::openBeneathOnMount(container, name.data(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!directory)
         return failed("the new content's directory cannot be opened", directory.error());
-    if (!isOursAndClosed(directory->get()))
+    if (!zor::fs::isFreshDirectory(directory->get()))
         return failed("somebody put something else in the place of the new content's directory");
     sealed.directory_ = std::move(*directory);
     return sealed;
