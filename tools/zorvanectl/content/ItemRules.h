@@ -2,8 +2,9 @@
 // What may come into a container, and under which name: the same for archives and directories.
 //
 // Files, directories, and symbolic links that stay inside. Refused are devices, FIFOs and sockets, set-user-ID and
-// set-group-ID bits of files, names that lead out, and the name of the container's own metadata file. Nothing is left
-// out or changed in silence: one item that is refused refuses the whole.
+// set-group-ID bits of files, names that lead out, and the name of the container's own metadata file. One item that is
+// refused refuses the whole. Changed without a word are modes alone: sticky bits and the set-group-ID of directories do
+// not come in, and a directory's owner may always use it. Left out are names that vanish while a directory is copied.
 //
 // A link stays inside when ".." stands in its target only at the beginning, and not more often than directories lie
 // above the link. A ".." behind a name is refused, since that name may be a link itself. So each link leads from a real
