@@ -8,6 +8,7 @@
 #include "platform/linux/Names.h"
 #include "platform/linux/NotifySocket.h"
 #include "platform/linux/SignalDescriptor.h"
+#include "platform/linux/StandardDescriptors.h"
 #include "platform/linux/StatusSocket.h"
 
 #include <atomic>
@@ -26,7 +27,10 @@ using namespace zor;
 /// Two arenas serve the few threads that run at once; one for each thread that ever was would keep memory for ever.
 constexpr int mallocArenas = 2;
 
-void prepareProcess() {
+/// False when a standard descriptor is missing and stays so: its number would be some container's or client's.
+[[nodiscard]] bool prepareProcess() {
+    if (!platform::fillStandardDescriptors())
+        return false;
     ::umask(022);
     ::mallopt(M_ARENA_MAX, mallocArenas);
     std::signal(SIGPIPE, SIG_IGN);
@@ -35,6 +39,7 @@ void prepareProcess() {
         files.rlim_cur = files.rlim_max; // a connection takes two or three
         ::setrlimit(RLIMIT_NOFILE, &files);
     }
+    return true;
 }
 
 platform::Syncs syncsFromEnvironment() {
@@ -103,7 +108,8 @@ int main(int argumentCount, char** arguments) {
         std::fputs(options.error().text.c_str(), options.error().exitStatus == 0 ? stdout : stderr);
         return options.error().exitStatus;
     }
-    prepareProcess();
+    if (!prepareProcess())
+        return 1;
 
     using platform::RotatingLog;
     auto platform = platform::LinuxPlatform::open({
