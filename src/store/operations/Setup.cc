@@ -208,8 +208,7 @@ std::uint64_t ZORClientConnection::sweepStaging() {
     for (const FileURL& entry : *entries)
         if (!kept->contains(entry.lastPathComponent()))
             swept += _moveItemAtURLToDeathRow(entry, StartDeletionThread::no) ? 1 : 0;
-    for (const FileURL& leftover : services_.fileManager.copyLeftoversInDirectoryAtURL(staging))
-        (void)_moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
+    discardCopyLeftovers(staging);
     return swept;
 }
 
