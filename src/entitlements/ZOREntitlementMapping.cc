@@ -97,6 +97,7 @@ ZOREntitlementMapping::_onQueue_setEntitlementDictionaryValues(const std::vector
                          "Can't act on an invalid input: values count: %ld, IDs count: %ld",
                          static_cast<long>(values.size()), static_cast<long>(identifiers.size()));
     std::vector<std::pair<std::string, std::optional<plist::Value>>> previous;
+    const bool wasUnsaved = unsaved_;
     for (std::size_t i = 0; i < values.size(); ++i) {
         const bool hasValue = !values[i].empty();
         const plist::Value* current = entitlementMappingDict_.find(identifiers[i]);
@@ -105,6 +106,7 @@ ZOREntitlementMapping::_onQueue_setEntitlementDictionaryValues(const std::vector
         if (unchanged)
             continue;
         previous.emplace_back(identifiers[i], current ? std::optional(*current) : std::nullopt);
+        unsaved_ = true; // and so it stays if anything below throws
         if (hasValue)
             entitlementMappingDict_.set(identifiers[i], values[i]);
         else
@@ -118,15 +120,15 @@ ZOREntitlementMapping::_onQueue_setEntitlementDictionaryValues(const std::vector
     if (previous.empty() && !unsaved_)
         return {};
     auto written = _writeEntitlementMappingToDisk();
-    if (!written && written.error().underlying()->isPosix(EFBIG))
-        // No later save could succeed either: this change alone is refused.
+    // No later save could succeed either: this change alone is refused.
+    const bool takenBack = !written && written.error().underlying()->isPosix(EFBIG);
+    if (takenBack)
         for (auto& [key, value] : previous | std::views::reverse)
             if (value)
                 entitlementMappingDict_.set(key, std::move(*value));
             else
                 entitlementMappingDict_.erase(key);
-    else
-        unsaved_ = !written;
+    unsaved_ = takenBack ? wasUnsaved : !written;
     if (!written)
         log_.write(logLevelError, setFunction, "Error writing entitlement mappings to disk after set : %s",
                    written.error().text().c_str());

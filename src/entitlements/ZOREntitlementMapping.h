@@ -138,7 +138,7 @@ private:
     /// nullopt, logged, when that cannot be known.
     std::optional<std::set<std::string, std::less<>>> ownersOfSystemContainers() ZOR_EXCLUDES(entitlementQueue_);
 
-    ErrorCode _onQueue_processEntitlements(const plist::Dictionary* entitlements, const std::string* identifier,
+    ErrorCode _onQueue_processEntitlements(const plist::Dictionary* entitlements, const std::string& identifier,
                                            const plist::Dictionary* options) ZOR_REQUIRES(entitlementQueue_);
     Result<void> _onQueue_process(const plist::Dictionary* entitlements, const std::string& identifier,
                                   const plist::Dictionary* options) ZOR_REQUIRES(entitlementQueue_);

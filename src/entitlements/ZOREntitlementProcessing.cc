@@ -160,17 +160,15 @@ Result<void> ZOREntitlementMapping::_onQueue_process(const plist::Dictionary* en
 }
 
 ErrorCode ZOREntitlementMapping::_onQueue_processEntitlements(const plist::Dictionary* entitlements,
-                                                              const std::string* identifier,
+                                                              const std::string& identifier,
                                                               const plist::Dictionary* options) {
-    if (!identifier)
-        return ErrorCode::identifierMissing;
     try {
-        if (!canBeProcessed(*identifier, options))
+        if (!canBeProcessed(identifier, options))
             return makeError(log_, {processFunction, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                             "Can't act on an invalid object: ID: %s, parent ID: %s", ZOR_SHOWN(*identifier),
+                             "Can't act on an invalid object: ID: %s, parent ID: %s", ZOR_SHOWN(identifier),
                              plist::describe(parentIn(options)).c_str())
                 .replyCode();
-        const auto processed = _onQueue_process(entitlements, *identifier, options);
+        const auto processed = _onQueue_process(entitlements, identifier, options);
         return processed ? ErrorCode::success : processed.error().replyCode();
     } catch (const std::exception& exception) {
         return services_.boundary.caught({processFunction, __LINE__}, exception).replyCode();
@@ -180,14 +178,16 @@ ErrorCode ZOREntitlementMapping::_onQueue_processEntitlements(const plist::Dicti
 ErrorCode ZOREntitlementMapping::processEntitlements(const plist::Dictionary* entitlements,
                                                      const std::string* identifier, const plist::Dictionary* options) {
     const auto processed = services_.boundary.run({"processEntitlements", __LINE__}, [&]() -> Result<ErrorCode> {
-        if (identifier && canBeProcessed(*identifier, options)) {
+        if (!identifier)
+            return ErrorCode::identifierMissing;
+        if (canBeProcessed(*identifier, options)) {
             const MutexLock held(entitlementQueue_);
             if (!unsaved_ && _onQueue_stage(entitlements, *identifier, options, SayStaging::no).empty())
                 return ErrorCode::success;
         }
         const AllIdentifiersLock lock(services_.locks, LockMode::writing);
         const MutexLock held(entitlementQueue_);
-        return _onQueue_processEntitlements(entitlements, identifier, options);
+        return _onQueue_processEntitlements(entitlements, *identifier, options);
     });
     return processed ? *processed : processed.error().replyCode();
 }
@@ -210,7 +210,7 @@ void ZOREntitlementMapping::removeEntitlementDictionariesForIdentifierAndItsChil
             if (const std::string* name = child.asString())
                 all.push_back(*name);
     for (const std::string& one : all) {
-        const ErrorCode code = _onQueue_processEntitlements(nullptr, &one, nullptr);
+        const ErrorCode code = _onQueue_processEntitlements(nullptr, one, nullptr);
         if (code != ErrorCode::success)
             log_.write(logLevelError, "_onQueue_removeEntitlementDictionariesForIdentifierAndItsChildren",
                        "Failed to clear entitlements for %s : %llu", ZOR_SHOWN(one),

@@ -14,7 +14,8 @@ inline constexpr std::size_t nestingMax = 64;
 /// reference is at least one byte, and one Value here (an entry: two, and one key and Value), so at 64 whatever shares
 /// nothing pays for itself and so does sharing of short keys and scalars; sharing that multiplies does not. In a long
 /// list a member of its own takes five bytes and more (reference, marker, offset), so 16 is enough there, and the
-/// largest request, 1 MiB, cannot take more than 19 MiB of a thread.
+/// largest request, 1 MiB, cannot take more than 19 MiB of a thread, and half as much again for what the allocator adds
+/// to small pieces and for putting a dictionary's keys in order.
 constexpr std::size_t memoryBytesMax(std::size_t inputBytes) {
     constexpr std::size_t smallInputBytes = std::size_t{64} << 10;
     const std::size_t head = inputBytes < smallInputBytes ? inputBytes : smallInputBytes;

@@ -5,6 +5,7 @@
 #include <cmath>
 #include <limits>
 #include <numeric>
+#include <utility>
 
 namespace zor::plist {
 
@@ -19,6 +20,22 @@ template <typename Iterator>
 Iterator lowerBound(Iterator first, Iterator last, std::string_view key) {
     return std::lower_bound(
         first, last, key, [](const Dictionary::Entry& entry, std::string_view wanted) { return entry.first < wanted; });
+}
+
+/// Moves the entry at order[i] to i, for each i, without a second array. `order` is used up.
+void putInOrder(std::vector<Dictionary::Entry>& entries, std::vector<std::size_t>& order) {
+    for (std::size_t first = 0; first < order.size(); ++first) {
+        if (order[first] == first)
+            continue;
+        Dictionary::Entry held = std::move(entries[first]);
+        std::size_t at = first;
+        while (order[at] != first) {
+            entries[at] = std::move(entries[order[at]]);
+            at = std::exchange(order[at], at);
+        }
+        entries[at] = std::move(held);
+        order[at] = at;
+    }
 }
 
 } // namespace
@@ -41,12 +58,17 @@ Dictionary Dictionary::fromUnsorted(std::vector<Entry> entries) {
         const int compared = entries[left].first.compare(entries[right].first);
         return compared != 0 ? compared < 0 : left < right;
     });
-    result.entries_.reserve(entries.size());
-    for (std::size_t at = 0; at < order.size(); ++at) {
-        // Of a run of equal keys only the last stays.
-        if (at + 1 == order.size() || entries[order[at]].first != entries[order[at + 1]].first)
-            result.entries_.push_back(std::move(entries[order[at]]));
-    }
+    putInOrder(entries, order);
+    // Of a run of equal keys only the last stays.
+    std::size_t kept = 0;
+    for (std::size_t at = 0; at < entries.size(); ++at)
+        if (at + 1 == entries.size() || entries[at].first != entries[at + 1].first) {
+            if (kept != at)
+                entries[kept] = std::move(entries[at]);
+            ++kept;
+        }
+    entries.erase(entries.begin() + static_cast<std::ptrdiff_t>(kept), entries.end());
+    result.entries_ = std::move(entries);
     return result;
 }
 

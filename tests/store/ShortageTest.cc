@@ -1,11 +1,13 @@
 // SPDX-License-Identifier: Apache-2.0
 // What the daemon could not look at, for want of descriptors or because the disk refused: it deletes nothing for that,
 // and keeps no answer that came of it.
+#include "entitlements/ZOREntitlementMapping.h"
 #include "store/FewDescriptors.h"
 #include "store/operations/ReplaceJournal.h"
 #include "world/World.h"
 
 #include <gtest/gtest.h>
+#include <new>
 #include <unistd.h>
 
 namespace zor::test {
@@ -99,6 +101,22 @@ TEST_F(Shortage, ASizeMeasuredInPartIsNotKept) {
         inPart += measured < whole.bytes ? 1 : 0;
     }
     EXPECT_GT(inPart, 1);
+}
+
+// Goal: what a client was told to have failed is saved when it asks again. Method: memory that is short while the map
+// is written, the same request, then a launch.
+TEST_F(Shortage, AnEntitlementThatWasNotSavedIsSavedWhenAskedAgain) {
+    const std::string identifier = "app";
+    const plist::Dictionary entitlements{{"k", "v"}};
+    world.disk().arm({.filter = [](const support::DiskCallInfo&) -> bool { throw std::bad_alloc(); }});
+    const auto process = [&] {
+        return world.services().entitlements().processEntitlements(&entitlements, &identifier, nullptr);
+    };
+    EXPECT_EQ(process(), ErrorCode::exceptionCaught);
+    world.disk().disarm();
+    EXPECT_EQ(process(), ErrorCode::success);
+    world.restart();
+    EXPECT_TRUE(world.services().entitlements().entitlementMappingDict().find(identifier));
 }
 
 } // namespace
