@@ -5,12 +5,52 @@
 #include "fs/Stretches.h"
 #include "platform/Mutex.h"
 
+#include <iterator>
 #include <map>
+#include <optional>
 #include <vector>
 
 namespace zor {
 
 namespace {
+
+/// What is said one by one of a directory's entries that are no containers: a user may have filled it with any number.
+constexpr std::size_t refusalsSaidMax = 200;
+
+/// The entries that could not be read as containers. Any thread.
+class Refusals {
+public:
+    void add(std::size_t index, ZORError error) {
+        const ZORError* const cause = error.underlying();
+        const platform::MutexLock held(mutex_);
+        ++count_;
+        if (cause && cause->isOwnShortage())
+            shortage_ = cause->code();
+        first_.emplace(index, std::move(error));
+        if (first_.size() > refusalsSaidMax)
+            first_.erase(std::prev(first_.end()));
+    }
+    /// In the directory's order.
+    void say(const Log& log, const FileURL& directory) {
+        const platform::MutexLock held(mutex_);
+        for (const auto& [index, error] : first_)
+            logError(log, error);
+        if (count_ > first_.size())
+            log.write(logLevelError, "readAndValidateMetadataAtUrl", "%llu more entries of %s are no containers",
+                      static_cast<unsigned long long>(count_ - first_.size()), directory.c_str());
+    }
+    /// The errno when this process was short of descriptors or memory.
+    [[nodiscard]] std::optional<int> shortage() {
+        const platform::MutexLock held(mutex_);
+        return shortage_;
+    }
+
+private:
+    platform::Mutex mutex_;
+    std::uint64_t count_ ZOR_GUARDED_BY(mutex_) = 0;
+    std::map<std::size_t, ZORError> first_ ZOR_GUARDED_BY(mutex_);
+    std::optional<int> shortage_ ZOR_GUARDED_BY(mutex_);
+};
 
 /// The names of a directory in one block of memory, each NUL-terminated.
 struct Names {
@@ -49,25 +89,20 @@ Result<void> ClassDirectoryReader::forEach(const std::function<void(std::shared_
     const MetadataReader reader(directory->get(), std::make_shared<const std::string>(directory_.path()), userId_,
                                 CheckClassPath::yes);
     std::vector<std::shared_ptr<ZORMetadata>> records(names.starts.size());
-    platform::Mutex mutex;
-    std::map<std::size_t, ZORError> errors;
+    Refusals refusals;
     fs::forEachStretch(records.size(), [&](std::size_t begin, std::size_t end) {
         for (std::size_t i = begin; i < end; ++i) {
             auto record = reader.read(names.at(i));
-            if (record) {
+            if (record)
                 records[i] = std::move(*record);
-            } else {
-                const platform::MutexLock held(mutex);
-                errors.emplace(i, std::move(record).error());
-            }
+            else
+                refusals.add(i, std::move(record).error());
         }
     });
-    for (const auto& [index, error] : errors) {
-        logError(log_, error);
-        // What this process could not look at may be a container. Taken for none, it would get a double.
-        if (const ZORError* cause = error.underlying(); cause && cause->isOwnShortage())
-            return failed(cause->code());
-    }
+    refusals.say(log_, directory_);
+    // What this process could not look at may be a container. Taken for none, it would get a double.
+    if (const auto shortage = refusals.shortage())
+        return failed(*shortage);
     for (auto& record : records)
         if (record)
             found(std::move(record));
