@@ -108,7 +108,10 @@ Result<void> ZORContainerCache::checkOnDisk(Here here, const Key& key, const Fou
     if (!item && item.error() != ENOENT)
         log_.write(logLevelError, "itemExistsAtURL", "Failed to determine if %s exists: %s", file.c_str(),
                    errorText(item.error()));
-    return makeError(log_, here, ErrorCode::cachedContainerWithoutMetadata, nullptr, LogFlag::yes,
+    std::optional<ZORError> cause;
+    if (!item && isOwnShortage(item.error()))
+        cause = posixError(here, item.error(), "open of %s failed: %s", file.c_str(), errorText(item.error()));
+    return makeError(log_, here, ErrorCode::cachedContainerWithoutMetadata, cause ? &*cause : nullptr, LogFlag::yes,
                      "Cache: %s%s: INCONSISTENT-No Metadata at: %s", className(key.containerClass),
                      suffix(key.transient), file.c_str());
 }
@@ -135,19 +138,22 @@ Result<ZORContainerCache::Record> ZORContainerCache::containerForUser(std::uint3
     });
 }
 
-ZORContainerCache::Record ZORContainerCache::containerForUser(std::uint32_t userId, ContainerClass containerClass,
-                                                              const std::string* identifier,
-                                                              std::string_view uuidString) {
+Result<ZORContainerCache::Record> ZORContainerCache::containerForUser(std::uint32_t userId,
+                                                                      ContainerClass containerClass,
+                                                                      const std::string* identifier,
+                                                                      std::string_view uuidString) {
     for (const bool transient : {false, true}) {
-        const auto record = containerForUser(userId, containerClass, identifier, transient);
+        auto record = containerForUser(userId, containerClass, identifier, transient);
+        if (!record && record.error().isOwnShortage())
+            return record;
         if (record && (*record)->uuid().string() == uuidString) {
             // Readers of one container may be here together: nothing is written that is so already.
             if ((*record)->transient() != transient)
                 (*record)->setTransient(transient);
-            return *record;
+            return record;
         }
     }
-    return nullptr;
+    return Record();
 }
 
 Result<std::vector<ZORContainerCache::Record>>
@@ -170,9 +176,13 @@ ZORContainerCache::allContainersForUser(std::uint32_t userId, ContainerClass con
         }
         std::vector<Record> records;
         records.reserve(all.size());
-        for (Found& found : all)
-            if (checkOnDisk(here, key, found, "ALL Found"))
+        for (Found& found : all) {
+            const auto there = checkOnDisk(here, key, found, "ALL Found");
+            if (!there && there.error().isOwnShortage())
+                return there.error();
+            if (there)
                 records.push_back(std::move(found.record));
+        }
         return records;
     });
 }

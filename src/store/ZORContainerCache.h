@@ -43,10 +43,10 @@ public:
     Result<Record> containerForUser(std::uint32_t userId, ContainerClass containerClass, const std::string* identifier,
                                     bool transient);
     /// The record whose internal UUID is `uuidString` (upper-case), live before transient; its transient flag is set
-    /// accordingly. nullptr when there is none.
-    Record containerForUser(std::uint32_t userId, ContainerClass containerClass, const std::string* identifier,
-                            std::string_view uuidString);
-    /// Every record whose metadata file is still there.
+    /// accordingly. nullptr when there is none; an error only where want of descriptors or memory leaves that open.
+    Result<Record> containerForUser(std::uint32_t userId, ContainerClass containerClass, const std::string* identifier,
+                                    std::string_view uuidString);
+    /// Every record whose metadata file is still there. Want of descriptors or memory makes none go missing: error 44.
     Result<std::vector<Record>> allContainersForUser(std::uint32_t userId, ContainerClass containerClass,
                                                      bool transient);
     /// Stores the record under its identifier, at `place`, over any other of that identifier.

@@ -15,7 +15,8 @@ std::string ZORError::text() const {
 }
 
 bool ZORError::isOwnShortage() const {
-    return domain_ == ErrorDomain::posix && zor::isOwnShortage(code_);
+    return (domain_ == ErrorDomain::posix && zor::isOwnShortage(code_)) ||
+           (underlying_ && underlying_->isOwnShortage());
 }
 
 ErrorCode ZORError::replyCode() const {

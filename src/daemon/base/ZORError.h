@@ -42,7 +42,7 @@ public:
         return domain_ == ErrorDomain::zor && code_ == static_cast<int>(code);
     }
     [[nodiscard]] bool isPosix(int number) const { return domain_ == ErrorDomain::posix && code_ == number; }
-    /// Whether its POSIX number is one of those.
+    /// Whether its POSIX number, or that of what caused it, is one of those.
     [[nodiscard]] bool isOwnShortage() const;
     /// What a client gets as "ReplyError": the code, sign-extended from 32 bits. There 1 is success, so EPERM leaves as
     /// EACCES.

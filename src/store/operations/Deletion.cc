@@ -86,7 +86,7 @@ Result<void> ZORClientConnection::stageForDelete(const DeletionBatch& batch, std
                   uuid ? uuid->string().c_str() : "(null)", ZOR_SHOWN(identifier), static_cast<long>(containerClass));
         return {};
     }
-    const auto record = services_.cache.containerForUser(userId, containerClass, &*identifier, uuid->string());
+    const auto record = TRY(services_.cache.containerForUser(userId, containerClass, &*identifier, uuid->string()));
     if (!record)
         return {};
     if (isBundleClass(containerClass))
@@ -149,7 +149,7 @@ Result<void> ZORClientConnection::moveAwayForDelete(const FileURL& container, co
     const auto moved = TRY(fileManager.moveItem(from->directory.get(), container, to->directory.get(), destination));
     // A copy does not fail when only the source cannot go: it would be found again. After a move by name, what lies
     // there is the owner's next tree, and none of ours.
-    if (moved == ZORFileManager::Moved::byCopy && fileManager.itemExistsAtURL(container))
+    if (moved == ZORFileManager::Moved::byCopy && !fileManager.itemDoesNotExistAtURL(container))
         return posixError(ZOR_HERE, EBUSY, "%s is still there", container.c_str());
     return {};
 }

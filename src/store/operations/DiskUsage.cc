@@ -47,7 +47,7 @@ void ZORClientConnection::keepDiskUsage(const ContainerAddress& address, const F
     const IdentifierLock lock(services_.locks, address.uuid->string(), LockMode::writing);
     const auto record = services_.cache.containerForUser(address.userId, address.containerClass, &*address.identifier,
                                                          address.uuid->string());
-    if (!record || record->url() != measured)
+    if (!record || !*record || (*record)->url() != measured)
         return;
     const plist::Value value(bytes);
     const auto kept = setInfoValue(&value, &staticDiskUsageKey, address, UseLocking::no);

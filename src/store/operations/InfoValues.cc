@@ -34,9 +34,9 @@ Result<void> ZORClientConnection::checkAddress(const char* function, const Conta
 
 Result<std::shared_ptr<ZORMetadata>> ZORClientConnection::knownContainer(const char* function,
                                                                          const ContainerAddress& address) {
-    auto record =
-        services_.cache.containerForUser(address.userId, address.containerClass,
-                                         address.identifier ? &*address.identifier : nullptr, address.uuid->string());
+    auto record = TRY(services_.cache.containerForUser(address.userId, address.containerClass,
+                                                       address.identifier ? &*address.identifier : nullptr,
+                                                       address.uuid->string()));
     if (record)
         return record;
     return makeError(services_.log, {function, __LINE__}, ErrorCode::notFound, nullptr, LogFlag::yes,

@@ -149,7 +149,8 @@ Result<void> ZORClientConnection::prepareReplace(const ReplaceRequest& request, 
     const auto known = [&](std::uint32_t userId, const std::optional<UUID>& uuid,
                            const std::optional<std::string>& identifier,
                            ContainerClass containerClass) -> Result<std::shared_ptr<ZORMetadata>> {
-        auto record = services_.cache.containerForUser(userId, containerClass, pointerTo(identifier), uuid->string());
+        auto record =
+            TRY(services_.cache.containerForUser(userId, containerClass, pointerTo(identifier), uuid->string()));
         if (!record)
             return makeError(log, here, ErrorCode::notFound, nullptr, LogFlag::yes,
                              "No Container with userId: %u UUID: %s, identifier: %s, Class: %ld", userId,
