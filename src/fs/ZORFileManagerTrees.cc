@@ -61,7 +61,12 @@ Result<void> ZORFileManager::removeItemAtURL(const std::optional<FileURL>& url) 
         if (failure.error != ENOENT)
             log_.write(logLevelError, function, "prunetree hit error for %s : %s", ZOR_SHOWN(path),
                        errorText(failure.error));
-        if (failure.error == EPERM) {
+        struct stat status{};
+        const bool examined = ::fstatat(failure.parent, failure.name, &status, AT_SYMLINK_NOFOLLOW) == 0;
+        if (failure.error == EPERM && !examined)
+            log_.write(logLevelError, function, "Failed to stat %s before unsetting UF_IMMUTABLE: %s", ZOR_SHOWN(path),
+                       errorText(errno));
+        if (failure.error == EPERM && examined) {
             const int cleared = fs::clearImmutable(disk_, failure.parent, failure.name);
             if (cleared < 0)
                 log_.write(logLevelError, function, "Failed to lchflags %s: %s", ZOR_SHOWN(path), errorText(-cleared));
@@ -125,9 +130,10 @@ Result<void> ZORFileManager::copyTree(const FileURL& source, const FileURL& dest
         const int directory = to->directory.get();
         status = fs::copyTree(disk_, from->directory.get(), from->name.c_str(), directory, hidden.c_str());
         // Nothing of a copy may be missing once it has its name, whatever the power does.
-        if (status == 0)
-            if (const auto copied = platform::openBeneath(directory, ".", O_RDONLY | O_DIRECTORY))
-                status = disk_.syncFileSystem(copied->get());
+        if (status == 0) {
+            const auto copied = platform::openBeneath(directory, ".", O_RDONLY | O_DIRECTORY);
+            status = copied ? disk_.syncFileSystem(copied->get()) : -copied.error();
+        }
         if (status == 0)
             status = disk_.rename(directory, hidden.c_str(), directory, to->name.c_str(), 0);
         if (status < 0)

@@ -2,6 +2,7 @@
 #include "store/operations/ContainerBuilder.h"
 
 #include "fs/AtomicFile.h"
+#include "fs/OwnedFile.h"
 #include "platform/linux/Openat2.h"
 #include "plist/Binary.h"
 #include "store/Names.h"
@@ -78,8 +79,9 @@ Result<void> ContainerBuilder::_createSubDirectories() {
 
 Result<void> ContainerBuilder::writeMetadata(const ZORMetadata& record) {
     const auto bytes = plist::writeBinary(record.fileContent());
-    int status = -EINVAL;
-    if (bytes)
+    int status = bytes ? -EFBIG : -EINVAL;
+    // What no reader would take must not be acknowledged.
+    if (bytes && bytes->size() <= fs::metadataFileBytesMax)
         status = fs::writeNewFile(disk_, directory_.get(), names::metadataFile, metadataMode, *bytes);
     if (status >= 0) {
         metadata_ = FileDescriptor(status);
