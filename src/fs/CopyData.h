@@ -20,7 +20,7 @@ public:
     explicit CopyData(platform::Disk& disk, Copied copied = {}) : disk_(disk), copied_(std::move(copied)) {}
 
     /// Both files are open at their beginning, `to` is new. `status` is of `from`: not more than its size is copied,
-    /// however fast the file grows. 0 or -errno.
+    /// however fast the file grows; where the data is shared, the whole file is. 0 or -errno.
     int copy(int from, int to, const struct stat& status);
 
 private:

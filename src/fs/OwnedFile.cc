@@ -32,8 +32,8 @@ std::expected<plist::Data, int> readOwnedFile(int directory, const char* path, s
         return std::unexpected(errno);
     if (const int refused = judge(status, bytesMax, formerOwner))
         return std::unexpected(refused);
-    // One byte more than it had tells a file that grows while it is read from one that was read whole.
-    plist::Data bytes(static_cast<std::size_t>(status.st_size) + 1);
+    // One that grows meanwhile is read to its old size.
+    plist::Data bytes(static_cast<std::size_t>(status.st_size));
     std::size_t length = 0;
     while (length < bytes.size()) {
         const ssize_t count = ::read(file->get(), bytes.data() + length, bytes.size() - length);
@@ -41,22 +41,12 @@ std::expected<plist::Data, int> readOwnedFile(int directory, const char* path, s
             continue;
         if (count < 0)
             return std::unexpected(errno);
-        length += static_cast<std::size_t>(count);
-        if (count == 0 || length == static_cast<std::size_t>(status.st_size))
+        if (count == 0)
             break;
+        length += static_cast<std::size_t>(count);
     }
     bytes.resize(length);
     return bytes;
-}
-
-int isRegularFile(int directory, const char* path) {
-    const auto item = platform::openBeneath(directory, path, O_PATH | O_NOFOLLOW);
-    if (!item)
-        return item.error();
-    struct stat status{};
-    if (::fstat(item->get(), &status) != 0)
-        return errno;
-    return S_ISREG(status.st_mode) ? 0 : EINVAL;
 }
 
 } // namespace zor::fs

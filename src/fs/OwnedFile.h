@@ -22,7 +22,4 @@ inline constexpr std::size_t metadataFileBytesMax = std::size_t{1} << 20;
 [[nodiscard]] std::expected<plist::Data, int> readOwnedFile(int directory, const char* path, std::size_t bytesMax,
                                                             std::optional<uid_t> formerOwner = std::nullopt);
 
-/// Whether `path` below `directory` is a regular file, reached without a link: 0, or an errno (EINVAL: something else).
-[[nodiscard]] int isRegularFile(int directory, const char* path);
-
 } // namespace zor::fs

@@ -6,7 +6,7 @@
 //   - after an old transient container moved to death row: that container gone, as was asked;
 //   - after the move into the class directory: the container, whole; the cache of the next process finds it.
 // What a power cut leaves is the same: the metadata file's data is on the disk before the move can be
-// (fs/Durability.h), and the move is on the disk before anybody is told of the container.
+// (fs/Durability.h), and the move is on the disk before anybody who asks for the identifier is told of the container.
 //
 // The sync after the move runs when the all-identifiers lock is released, so those of concurrent creators share the
 // disk's commit. Until it is done the record says so, and whoever finds it meanwhile waits for a sync of its own before
