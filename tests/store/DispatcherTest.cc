@@ -178,6 +178,8 @@ TEST_F(Dispatch, Lists) {
     Dictionary transientOnes = list;
     transientOnes.set("Transient", true);
     EXPECT_EQ(request(transientOnes).array("ReplyIdsArray")->size(), 0U);
+    EXPECT_EQ(request({{"Command", 1}, {"ContainerClass", 14}, {"UserID", 1}}),
+              (Dictionary{{"ReplyError", std::uint64_t{11}}}));
 }
 
 // Goal: a refused client cannot fill the log, nor another's share. Method: more refusals than a second's share.

@@ -223,6 +223,7 @@ TEST(Whitelist, TheTableFile) {
                                   {"SystemGroup", Dictionary{{"systemgroup.x", "name"}}}}));
     const ZORWhitelist& table = world.services().whitelist();
     EXPECT_EQ(table.wellknownSystemContainers(), (Strings{"good", "longest"}));
+    EXPECT_EQ(table.wellknownSystemGroupContainers(), Strings{"systemgroup.x"});
     EXPECT_EQ(*table.wellknownSystemGroupContainerForId("systemgroup.x"), "name");
     EXPECT_FALSE(table.systemContainerIdIsWellknown("com.veltra.settingsd"));
     EXPECT_EQ(world.log.take(3, "ZORWhitelist").size(), 7U);
