@@ -178,7 +178,7 @@ TEST_F(Known, OperationsRunTogether) {
         [&](int) { EXPECT_TRUE(world.find("com.example")); },
     };
     inParallel(static_cast<int>(std::size(operations)), [&](int thread) {
-        for (int i = 0; thread == 0 ? i < 150 : !end; ++i)
+        for (int i = 0; thread == 0 ? i < 80 : !end; ++i)
             operations[thread](i);
         end = end || thread == 0;
     });
