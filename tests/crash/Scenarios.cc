@@ -157,6 +157,17 @@ const std::vector<UpcallItem>& upcallItems() {
     return items;
 }
 
+/// The answers are asked for without a socket. The platform's own port has no room for replies before it listens.
+class NoUpcallPort final : public platform::UpcallPort {
+public:
+    int checkIn() override { return 0; }
+    [[nodiscard]] const char* checkInCallName() const override { return "none"; }
+    bool serve(platform::RunLoop&, std::function<std::vector<std::uint8_t>(const platform::UpcallPacket&)>) override {
+        return true;
+    }
+    [[nodiscard]] const char* sourceCallName() const override { return "none"; }
+};
+
 /// Promises what a reply with status 1 names.
 void makeUpcall(Device& device) {
     const PackbuffPointer packbuff(sb_packbuff_new(256));
@@ -165,7 +176,8 @@ void makeUpcall(Device& device) {
         sb_packbuff_pack_string(packbuff.get(), asked, request.identifier.c_str(),
                                 static_cast<std::uint32_t>(request.identifier.size()));
     const auto packet = upcall::encodeRequest({sb_packbuff_get_bytes(packbuff.get()), packbuff->bytes_used});
-    UpcallServer& server = device.daemon->composition().upcallServer();
+    const NoUpcallPort port;
+    UpcallServer server(device.daemon->composition().store(), port);
     const auto answer = server.answer({.bytes = packet, .senderPid = 0, .senderUserId = 0});
     const auto reply = upcall::decodeReply(answer);
     must(reply && reply->returnCode == upcall::ReturnCode::success && !reply->buffer.empty(), "no answer to an upcall");
