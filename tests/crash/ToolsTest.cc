@@ -8,11 +8,13 @@
 #include "support/ProcessResources.h"
 
 #include <algorithm>
+#include <csignal>
 #include <fcntl.h>
 #include <functional>
 #include <future>
 #include <gtest/gtest.h>
 #include <memory>
+#include <sys/resource.h>
 #include <thread>
 #include <unistd.h>
 
@@ -315,7 +317,7 @@ TEST(PowerCutDirectoryTest, TellsSoundFromWrong) {
     }
 }
 
-// Goal: the recorder cannot be passed by. Method: changes around it.
+// Goal: the recorder cannot be passed by. Method: a write that the kernel ends in the middle, and changes around it.
 TEST(RecordingDiskTest, FindsWhatItWasNotTold) {
     const TemporaryDirectory root;
     const FileDescriptor top = openDirectory(root.path());
@@ -323,7 +325,15 @@ TEST(RecordingDiskTest, FindsWhatItWasNotTold) {
     RecordingDisk disk(linuxDisk, root.path());
     disk.start();
     const FileDescriptor file(disk.createFile(top.get(), "f", 0600));
-    EXPECT_EQ(disk.complaint(), "");
+    struct rlimit before = {};
+    ASSERT_EQ(::getrlimit(RLIMIT_FSIZE, &before), 0);
+    const struct rlimit small = {.rlim_cur = 3, .rlim_max = before.rlim_max};
+    const auto handler = std::signal(SIGXFSZ, SIG_IGN);
+    ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &small), 0);
+    EXPECT_EQ(disk.write(file.get(), Bytes{1, 2, 3, 4, 5}), -EFBIG);
+    ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &before), 0);
+    std::signal(SIGXFSZ, handler);
+    EXPECT_EQ(disk.complaint(), "") << "the first three bytes are recorded";
     makeDirectory(top.get(), "unseen", 0700);
     EXPECT_NE(disk.complaint(), "");
     ASSERT_EQ(::unlinkat(top.get(), "unseen", AT_REMOVEDIR), 0);
