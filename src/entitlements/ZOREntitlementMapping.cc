@@ -122,12 +122,13 @@ ZOREntitlementMapping::_onQueue_setEntitlementDictionaryValues(const std::vector
     auto written = _writeEntitlementMappingToDisk();
     // No later save could succeed either: this change alone is refused.
     const bool takenBack = !written && written.error().underlying()->isPosix(EFBIG);
-    if (takenBack)
+    if (takenBack) {
         for (auto& [key, value] : previous | std::views::reverse)
             if (value)
                 entitlementMappingDict_.set(key, std::move(*value));
             else
                 entitlementMappingDict_.erase(key);
+    }
     unsaved_ = takenBack ? wasUnsaved : !written;
     if (!written)
         log_.write(logLevelError, setFunction, "Error writing entitlement mappings to disk after set : %s",

@@ -4,7 +4,7 @@
 #include "daemon/base/ZORLocks.h"
 #include "support/RecordingLog.h"
 
-#include <array>
+#include <atomic>
 #include <chrono>
 #include <functional>
 #include <future>
@@ -38,7 +38,9 @@ protected:
     static bool ends(std::future<void>& call, std::chrono::milliseconds limit) {
         return call.wait_for(limit) == std::future_status::ready;
     }
-    std::future<void> begin(std::function<void()> call) { return std::async(std::launch::async, std::move(call)); }
+    static std::future<void> begin(std::function<void()> call) {
+        return std::async(std::launch::async, std::move(call));
+    }
     /// Everything is free exactly when this does not wait.
     bool allIsFree() {
         auto probe = begin([this] {
@@ -77,62 +79,59 @@ TEST_F(Locks, SeveralAreTakenOnceEachAscendingAndReleasedDescending) {
                            }));
 }
 
-// Goal: every pair of lock requests excludes or admits as it should. Method: hold the first, ask for the second in
-// another thread; one that has to wait must end after the release, and not before.
+// Every pair of lock requests excludes or admits as it should: the first is held, the second asked for in another
+// thread; one that has to wait ends after the release, and not before.
 TEST_F(Locks, WhoWaitsForWhom) {
     struct Request {
         const char* name;
-        std::function<void(ZORLocks&)> take;
-        std::function<void(ZORLocks&)> release;
+        const char* identifier; // nullptr: all
+        LockMode mode;
     };
-    const auto one = [](const char* identifier, LockMode mode) {
-        return [=](ZORLocks& all) { all._lock_identifier(std::string_view(identifier), mode); };
+    const Request requests[] = {
+        {"A reading", "A", LockMode::reading},       {"A writing", "A", LockMode::writing},
+        {"B reading", "B", LockMode::reading},       {"B writing", "B", LockMode::writing},
+        {"all reading", nullptr, LockMode::reading}, {"all writing", nullptr, LockMode::writing},
     };
-    const auto oneOut = [](const char* identifier) {
-        return [=](ZORLocks& all) { all.unlock_identifier(std::string_view(identifier)); };
+    const auto take = [&](const Request& request) {
+        if (request.identifier)
+            locks._lock_identifier(std::string_view(request.identifier), request.mode);
+        else
+            locks._lock_all_identifiers(request.mode);
     };
-    const auto all = [](LockMode mode) { return [=](ZORLocks& every) { every._lock_all_identifiers(mode); }; };
-    const auto allOut = [](ZORLocks& every) { every.unlock_all_identifiers(); };
-    const std::array<Request, 6> requests = {{
-        {"A reading", one("A", LockMode::reading), oneOut("A")},
-        {"A writing", one("A", LockMode::writing), oneOut("A")},
-        {"B reading", one("B", LockMode::reading), oneOut("B")},
-        {"B writing", one("B", LockMode::writing), oneOut("B")},
-        {"all reading", all(LockMode::reading), allOut},
-        {"all writing", all(LockMode::writing), allOut},
-    }};
+    const auto release = [&](const Request& request) {
+        if (request.identifier)
+            locks.unlock_identifier(std::string_view(request.identifier));
+        else
+            locks.unlock_all_identifiers();
+    };
     constexpr bool waits = true;
     constexpr bool goes = false;
     const bool expected[6][6] = {
-        {goes, waits, goes, goes, goes, waits},   // A is read
-        {waits, waits, goes, goes, waits, waits}, // A is written
-        {goes, goes, goes, waits, goes, waits},     {goes, goes, waits, waits, waits, waits},
-        {goes, waits, goes, waits, goes, waits}, // all is read
-        {waits, waits, waits, waits, waits, waits},
+        {goes, waits, goes, goes, goes, waits},     // A is read
+        {waits, waits, goes, goes, waits, waits},   // A is written
+        {goes, goes, goes, waits, goes, waits},     // B is read
+        {goes, goes, waits, waits, waits, waits},   // B is written
+        {goes, waits, goes, waits, goes, waits},    // all is read
+        {waits, waits, waits, waits, waits, waits}, // all is written
     };
-    for (std::size_t held = 0; held < requests.size(); ++held)
-        for (std::size_t asked = 0; asked < requests.size(); ++asked) {
+    for (std::size_t held = 0; held < 6; ++held)
+        for (std::size_t asked = 0; asked < 6; ++asked) {
             SCOPED_TRACE(std::string(requests[held].name) + " is held, " + requests[asked].name + " is asked for");
-            requests[held].take(locks);
+            take(requests[held]);
             auto second = begin([&] {
-                requests[asked].take(locks);
-                requests[asked].release(locks);
+                take(requests[asked]);
+                release(requests[asked]);
             });
-            if (expected[held][asked]) {
-                EXPECT_FALSE(ends(second, 20ms));
-                requests[held].release(locks);
-            } else {
-                EXPECT_TRUE(ends(second, 10s));
-                requests[held].release(locks);
-            }
+            const bool waited = expected[held][asked];
+            EXPECT_EQ(ends(second, waited ? 20ms : 10s), !waited);
+            release(requests[held]);
             second.wait();
             EXPECT_EQ(locks.identifiersInUse(), 0U);
             EXPECT_TRUE(allIsFree());
         }
 }
 
-// Goal: who waits for an identifier's own lock counts already, so a writer of all comes after it. Method: two waiters
-// behind a reader, the writer of all last; the order in which they get through.
+// Who waits for an identifier's own lock counts already, so a writer of all comes after it.
 TEST_F(Locks, AnAdmittedIdentifierComesBeforeAWriterOfAll) {
     locks._lock_identifier("A", LockMode::reading);
     std::vector<std::string> order;
@@ -157,8 +156,7 @@ TEST_F(Locks, AnAdmittedIdentifierComesBeforeAWriterOfAll) {
     EXPECT_EQ(locks.identifiersInUse(), 0U);
 }
 
-// Goal: misuse is said and leaves every counter as it was. Method: after it the locks still exclude and still become
-// free.
+// Misuse is said and leaves every counter as it was: the locks still exclude and still become free.
 TEST_F(Locks, MisuseChangesNothing) {
     locks.unlock_identifier("A");
     locks.unlock_all_identifiers();
@@ -180,75 +178,50 @@ TEST_F(Locks, MisuseChangesNothing) {
     EXPECT_EQ(locks.identifiersInUse(), 0U);
 }
 
-TEST_F(Locks, AScopeReleasesOnce) {
-    {
-        AllIdentifiersLock scope(locks, LockMode::writing);
-        scope.unlock();
-        EXPECT_TRUE(allIsFree());
-    }
-    EXPECT_TRUE(allIsFree());
-    EXPECT_TRUE(sink.take(3, "unlock_all_identifiers").empty());
-}
-
-// Goal: exclusion holds under load, nothing deadlocks, no signal is lost. Method: pairs of plain numbers that every
-// holder changes or compares.
+// Exclusion holds under load, nothing deadlocks, no signal is lost: pairs of numbers that every holder changes or
+// compares.
 TEST_F(Locks, LoadOverEveryMode) {
-    constexpr int threadCount = 6;
-    constexpr int rounds = 1500;
-    const std::array<std::string, 4> names = {"A", "B", "C", "D"};
+    const std::string names[] = {"A", "B", "C", "D"};
     struct Pair {
         long first = 0;
         long second = 0;
     };
-    std::array<Pair, 4> guarded;
+    Pair guarded[4];
     std::atomic<long> broken{0};
     sink.setLevel(logLevelNotice);
-    std::vector<std::thread> threads;
-    for (int t = 0; t < threadCount; ++t)
-        threads.emplace_back([&, t] {
-            std::mt19937 random(static_cast<unsigned>(t));
-            const auto change = [&](std::size_t i) {
-                ++guarded[i].first;
-                ++guarded[i].second;
+    std::vector<std::jthread> threads;
+    for (unsigned seed = 0; seed < 6; ++seed)
+        threads.emplace_back([&, seed] {
+            std::mt19937 random(seed);
+            const auto use = [&](std::size_t i, LockMode mode) {
+                if (mode == LockMode::reading) {
+                    broken += guarded[i].first != guarded[i].second ? 1 : 0;
+                } else {
+                    ++guarded[i].first;
+                    ++guarded[i].second;
+                }
             };
-            const auto compare = [&](std::size_t i) { broken += guarded[i].first != guarded[i].second ? 1 : 0; };
-            for (int round = 0; round < rounds; ++round) {
+            for (int round = 0; round < 1500; ++round) {
+                const LockMode mode = random() % 2 == 0 ? LockMode::reading : LockMode::writing;
                 const std::size_t i = random() % 4;
                 const std::size_t j = random() % 4;
-                switch (random() % 6) {
-                case 0:
-                    locks._lock_identifier(names[i], LockMode::writing);
-                    change(i);
-                    locks.unlock_identifier(names[i]);
-                    break;
-                case 1:
-                case 2:
-                    locks._lock_identifier(names[i], LockMode::reading);
-                    compare(i);
-                    locks.unlock_identifier(names[i]);
-                    break;
-                case 3:
-                    locks._lock_identifier(std::vector<std::string>{names[i], names[j]}, LockMode::writing);
-                    change(i);
-                    change(j);
-                    locks.unlock_identifier(std::vector<std::string>{names[i], names[j]});
-                    break;
-                case 4: {
-                    const AllIdentifiersLock all(locks, LockMode::reading);
+                const unsigned kind = random() % 3;
+                if (kind == 0) {
+                    const IdentifierLock one(locks, names[i], mode);
+                    use(i, mode);
+                } else if (kind == 1) {
+                    locks._lock_identifier(std::vector{names[i], names[j]}, mode);
+                    use(i, mode);
+                    use(j, mode);
+                    locks.unlock_identifier(std::vector{names[i], names[j]});
+                } else {
+                    const AllIdentifiersLock all(locks, mode);
                     for (std::size_t k = 0; k < 4; ++k)
-                        compare(k);
-                    break;
-                }
-                default: {
-                    const AllIdentifiersLock all(locks, LockMode::writing);
-                    for (std::size_t k = 0; k < 4; ++k)
-                        change(k);
-                }
+                        use(k, mode);
                 }
             }
         });
-    for (std::thread& thread : threads)
-        thread.join();
+    threads.clear();
     EXPECT_EQ(broken, 0);
     EXPECT_EQ(locks.identifiersInUse(), 0U);
     EXPECT_TRUE(allIsFree());

@@ -22,8 +22,10 @@ public:
     [[nodiscard]] std::expected<platform::PasswordEntry, int> entryForName(std::string_view name) const override {
         ++lookups;
         std::this_thread::sleep_for(std::chrono::milliseconds(5));
-        if (name != "mobile" || !mobile_ || failure != 0)
-            return std::unexpected(failure != 0 ? failure : ENOENT);
+        if (failure != 0)
+            return std::unexpected(failure);
+        if (name != "mobile" || !mobile_)
+            return std::unexpected(ENOENT);
         return platform::PasswordEntry{.name = "mobile", .uid = *mobile_, .homeDirectory = "/private/var/mobile"};
     }
     mutable std::atomic<int> lookups{0};
@@ -33,7 +35,7 @@ private:
     const std::optional<std::uint32_t> mobile_;
 };
 
-// Goal: each class accepts exactly its owners. Method: the set of accepted ids among the ids next to every bound.
+// Each class accepts exactly its owners, of the ids next to every bound.
 TEST(UserIdentity, EachClassHasItsOwners) {
     const std::vector<std::uint32_t> bounds = {0, 1, 32, 33, 34, 498, 499, 500, 501, 510, 511, 4294967295U};
     for (std::uint64_t number = 0; number <= 15; ++number) {
@@ -53,7 +55,7 @@ TEST(UserIdentity, EachClassHasItsOwners) {
     EXPECT_FALSE(userIdIsValidForClass(static_cast<ContainerClass>((std::uint64_t{1} << 32) + 2), 501));
 }
 
-// Goal: the first matching rule decides. Method: a table with the resolved user, or none for error 38 and its one line.
+// The first matching rule decides: the resolved user, or none for error 38 and its one line.
 TEST(UserIdentity, RequestsResolveByClassAndClient) {
     struct Row {
         std::uint32_t requested;
@@ -61,7 +63,7 @@ TEST(UserIdentity, RequestsResolveByClassAndClient) {
         std::uint32_t client;
         std::optional<std::uint32_t> resolved;
     };
-    const std::vector<Row> rows = {
+    const Row rows[] = {
         // Bundle and system classes: the owner, whoever asks.
         {33, 1, 0, 33},
         {33, 8, 501, 33},
@@ -105,20 +107,18 @@ TEST(UserIdentity, RequestsResolveByClassAndClient) {
         const std::string text = formatted("Invalid userId %u for class %llu from client %u", row.requested,
                                            static_cast<unsigned long long>(row.containerClass), row.client);
         const auto lines = sink.take();
+        ASSERT_EQ(resolved.has_value(), row.resolved.has_value()) << text;
         if (row.resolved) {
-            ASSERT_TRUE(resolved) << text;
             EXPECT_EQ(*resolved, *row.resolved) << text;
             EXPECT_FALSE(support::hasLine(lines, 3, "validateUserId", text));
         } else {
-            ASSERT_FALSE(resolved) << text;
             EXPECT_TRUE(resolved.error().is(ErrorCode::valueNotAllowed)) << text;
             EXPECT_EQ(lines, (std::vector<support::LogLine>{{3, "validateUserId", text}}));
         }
     }
 }
 
-// Goal: one lookup for ever, and all first callers get its answer. Method: many threads ask at once, with and without
-// the account.
+// Many threads ask at once, with and without the account: one lookup for ever, and all first callers get its answer.
 TEST(UserIdentity, TheMobileUserIsLookedUpOnce) {
     for (const auto& account : {std::optional<std::uint32_t>(501), std::optional<std::uint32_t>()}) {
         support::RecordingLog sink(logLevelNotice);
@@ -126,11 +126,10 @@ TEST(UserIdentity, TheMobileUserIsLookedUpOnce) {
         const CountingPasswords passwords(account);
         UserIdentity users(log, passwords);
         std::atomic<int> agreeing{0};
-        std::vector<std::thread> threads;
+        std::vector<std::jthread> threads;
         for (int i = 0; i < 8; ++i)
             threads.emplace_back([&] { agreeing += users.getCurrentMobileUserId() == account.value_or(0) ? 1 : 0; });
-        for (std::thread& thread : threads)
-            thread.join();
+        threads.clear();
         EXPECT_EQ(agreeing, 8);
         EXPECT_EQ(passwords.lookups, 1);
         const char* message = account ? "Current mobile user ID is 501" : "Failed to get mobile uid. This is bad";
@@ -138,7 +137,7 @@ TEST(UserIdentity, TheMobileUserIsLookedUpOnce) {
     }
 }
 
-// Goal: what this process lacked when it asked does not stay the answer. Method: fail with each errno, then ask again.
+// What this process lacked when it asked does not stay the answer; any other failure does.
 TEST(UserIdentity, AShortageIsNoAnswer) {
     for (const auto& [failure, asked] : {std::pair(EMFILE, 2), std::pair(ENOMEM, 2), std::pair(EIO, 1)}) {
         support::RecordingLog sink(logLevelNotice);

@@ -22,14 +22,15 @@ using test::World;
 
 constexpr const char* uuid = "5DB3C5A9-6E4B-4C7C-9C57-1D6C7A1C0001";
 
+plist::Dictionary entitlements(const char* group, const char* systemGroup) {
+    return {{std::string(entitlementKeys::applicationGroups), plist::Array{plist::Value(group)}},
+            {std::string(entitlementKeys::systemGroups), plist::Array{plist::Value(systemGroup)}}};
+}
+
 /// A store with a container of each group of classes, as clients leave it.
 struct Store {
     Store() {
-        const plist::Dictionary owner{
-            {std::string(entitlementKeys::systemContainer), true},
-            {std::string(entitlementKeys::applicationGroups), plist::Array{plist::Value("group.a")}},
-            {std::string(entitlementKeys::systemGroups), plist::Array{plist::Value("systemgroup.a")}}};
-        EXPECT_TRUE(world.services().entitlements()._setEntitlementDictionaryValues({owner}, {"org.system"}));
+        registerOwner("org.system", entitlements("group.a", "systemgroup.a"));
         data = create("org.data", ContainerClass::dataApplication, 501);
         const std::string identifier = "org.data";
         dataUuid = world.daemonsClient()
@@ -42,6 +43,14 @@ struct Store {
         create("systemgroup.a", ContainerClass::sharedSystemGroup, 499);
         create("org.system", ContainerClass::dataSystem, 499);
         world.bootMarker.make();
+    }
+    void registerOwner(const char* identifier, plist::Dictionary entitlements) {
+        entitlements.set(std::string(entitlementKeys::systemContainer), true);
+        EXPECT_TRUE(world.services().entitlements()._setEntitlementDictionaryValues({entitlements}, {identifier}));
+    }
+    void setProtectionClass(const std::string& subdirectory) {
+        const platform::FileDescriptor file(::open((data + subdirectory).c_str(), O_RDONLY | O_CLOEXEC));
+        EXPECT_EQ(world.protection().setClass(file.get(), 1), 0);
     }
     std::string create(const std::string& identifier, ContainerClass containerClass, std::uint32_t user,
                        bool transient = false) {
@@ -57,14 +66,24 @@ struct Store {
         return checkStore(**system, options);
     }
     [[nodiscard]] std::string metadata() const { return data + "/" + names::metadataFile; }
-    void writeMetadata(const plist::Dictionary& changes) const {
+    /// Beside the container.
+    [[nodiscard]] std::string sibling(const std::string& name) const { return classDirectory() + "/" + name; }
+    [[nodiscard]] std::string classDirectory() const { return files::path(data).parent_path(); }
+    void setMetadata(const char* key, plist::Value value) const {
         plist::Dictionary content = test::metadataOf(2, 501, "org.data", uuid);
-        for (const auto& [key, value] : changes)
-            content.set(key, value);
+        content.set(key, std::move(value));
         std::ofstream(metadata(), std::ios::binary) << test::binary(content);
     }
-    void writeEntitlements(const std::string& bytes) {
-        world.write(std::string(test::libraryPath) + "/" + names::entitlementFile, bytes);
+    /// A file of the daemon's own.
+    void write(const std::string& name, const std::string& bytes = "x") {
+        world.write(std::string(test::libraryPath) + "/" + name, bytes);
+    }
+    /// A directory in its caches.
+    void leave(const std::string& where) { world.makeDirectories(std::string(test::cachesPath) + "/" + where); }
+    /// A link in its sandbox's state.
+    void map(const std::string& target, const std::string& name) {
+        world.makeDirectories("run/zorvane/sandbox/501/1");
+        files::create_symlink(target, world.path("run/zorvane/sandbox/501/1/" + name));
     }
 
     World world;
@@ -80,165 +99,120 @@ std::string textOf(const std::vector<Finding>& findings) {
     return text;
 }
 
-/// A directory of the daemon's caches, with a file in it.
-void leave(Store& store, const std::string& where) {
-    store.world.makeDirectories(std::string(test::cachesPath) + "/" + where);
-}
-
 struct Damage {
     const char* name;
     std::function<void(Store&)> inflict;
     FindingCode code;
     Mender mender;
     /// How the path ends.
-    const char* path;
+    std::string path = "";
     const char* rule = "";
 };
 
-void replaceByLink(const std::string& path, const char* target) {
+void replaceByLink(const std::string& path, const std::string& target) {
     files::rename(path, files::path(path).parent_path() / ".elsewhere");
     files::create_symlink(target, path);
 }
 
+void replaceByFifo(const std::string& path) {
+    files::remove(path);
+    EXPECT_EQ(::mkfifo(path.c_str(), 0644), 0);
+}
+
 const std::vector<Damage>& damages() {
     using enum FindingCode;
+    using enum Mender;
+    using S = Store&;
+    static const std::string mapping = "sandbox/501/1/";
     static const std::vector<Damage> rows = {
-        {"no metadata", [](Store& s) { files::remove(s.metadata()); }, metadataMissing, Mender::boot, ""},
-        {"garbage", [](Store& s) { std::ofstream(s.metadata()) << "x"; }, metadataInvalid, Mender::person, "",
-         "readable"},
-        {"two names", [](Store& s) { files::create_hard_link(s.metadata(), s.data + "/second"); }, metadataInvalid,
-         Mender::person, "", "readable"},
-        {"writable", [](Store& s) { ::chmod(s.metadata().c_str(), 0666); }, metadataInvalid, Mender::person, "",
-         "readable"},
-        {"a link to it", [](Store& s) { replaceByLink(s.metadata(), "/etc/passwd"); }, metadataInvalid, Mender::person,
+        {"no metadata", [](S s) { files::remove(s.metadata()); }, metadataMissing, boot},
+        {"garbage", [](S s) { std::ofstream(s.metadata()) << "x"; }, metadataInvalid, person, "", "readable"},
+        {"two names", [](S s) { files::create_hard_link(s.metadata(), s.data + "/second"); }, metadataInvalid, person,
          "", "readable"},
-        {"a FIFO",
-         [](Store& s) {
-             files::remove(s.metadata());
-             ::mkfifo(s.metadata().c_str(), 0644);
-         },
-         metadataInvalid, Mender::person, "", "readable"},
-        {"no identifier", [](Store& s) { s.writeMetadata({{"ZORMetadataIdentifier", 7}}); }, metadataInvalid,
-         Mender::person, "", "identifier"},
-        {"no UUID", [](Store& s) { s.writeMetadata({{"ZORMetadataUUID", "x"}}); }, metadataInvalid, Mender::person, "",
-         "uuid"},
-        {"no class", [](Store& s) { s.writeMetadata({{"ZORMetadataContentClass", 99}}); }, metadataInvalid,
-         Mender::person, "", "class"},
-        {"no info", [](Store& s) { s.writeMetadata({{"ZORMetadataInfo", plist::Array()}}); }, metadataInvalid,
-         Mender::person, "", "info"},
-        {"another user's", [](Store& s) { s.writeMetadata({{"ZORMetadataPersona", 502}}); }, wrongClassDirectory,
-         Mender::person, "", "user"},
-        {"another class's", [](Store& s) { s.writeMetadata({{"ZORMetadataContentClass", 4}}); }, wrongClassDirectory,
-         Mender::person, "", "place"},
-        {"copied",
-         [](Store& s) {
-             const std::string copy = files::path(s.data).parent_path() / uuid;
-             if (std::system(("cp -a " + s.data + " " + copy).c_str()) != 0)
-                 throw std::runtime_error("no copy");
-         },
-         doubledContainer, Mender::person, ""},
-        {"renamed", [](Store& s) { files::rename(s.data, files::path(s.data).parent_path() / "Junk"); }, containerName,
-         Mender::boot, "/Junk"},
-        {"closed", [](Store& s) { ::chmod(s.data.c_str(), 0700); }, containerAttributes, Mender::person, ""},
-        {"no subdirectory", [](Store& s) { files::remove_all(s.data + "/Library"); }, subdirectoryMissing,
-         Mender::daemon, "/Library"},
-        {"closed subdirectory", [](Store& s) { ::chmod((s.data + "/tmp").c_str(), 0700); }, subdirectoryAttributes,
+        {"writable", [](S s) { ::chmod(s.metadata().c_str(), 0666); }, metadataInvalid, person, "", "readable"},
+        {"a link to it", [](S s) { replaceByLink(s.metadata(), "/etc/passwd"); }, metadataInvalid, person, "",
+         "readable"},
+        {"a FIFO", [](S s) { replaceByFifo(s.metadata()); }, metadataInvalid, person, "", "readable"},
+        {"no identifier", [](S s) { s.setMetadata("ZORMetadataIdentifier", 7); }, metadataInvalid, person, "",
+         "identifier"},
+        {"no UUID", [](S s) { s.setMetadata("ZORMetadataUUID", "x"); }, metadataInvalid, person, "", "uuid"},
+        {"no class", [](S s) { s.setMetadata("ZORMetadataContentClass", 99); }, metadataInvalid, person, "", "class"},
+        {"no info", [](S s) { s.setMetadata("ZORMetadataInfo", plist::Array()); }, metadataInvalid, person, "", "info"},
+        {"another user's", [](S s) { s.setMetadata("ZORMetadataPersona", 502); }, wrongClassDirectory, person, "",
+         "user"},
+        {"another class's", [](S s) { s.setMetadata("ZORMetadataContentClass", 4); }, wrongClassDirectory, person, "",
+         "place"},
+        {"copied", [](S s) { EXPECT_EQ(std::system(("cp -a " + s.data + " " + s.sibling(uuid)).c_str()), 0); },
+         doubledContainer, person},
+        {"renamed", [](S s) { files::rename(s.data, s.sibling("Junk")); }, containerName, boot, "/Junk"},
+        {"closed", [](S s) { ::chmod(s.data.c_str(), 0700); }, containerAttributes, person},
+        {"no subdirectory", [](S s) { files::remove_all(s.data + "/Library"); }, subdirectoryMissing, Mender::daemon,
+         "/Library"},
+        {"closed subdirectory", [](S s) { ::chmod((s.data + "/tmp").c_str(), 0700); }, subdirectoryAttributes,
          Mender::daemon, "/tmp"},
-        {"a link for a subdirectory", [](Store& s) { replaceByLink(s.data + "/Library", "/"); }, wrongShape,
-         Mender::person, "/Library"},
-        {"a FIFO for a subdirectory",
-         [](Store& s) {
-             files::remove(s.data + "/tmp");
-             ::mkfifo((s.data + "/tmp").c_str(), 0644);
-         },
-         wrongShape, Mender::person, "/tmp"},
-        {"a link for a container", [](Store& s) { replaceByLink(s.data, "/"); }, wrongShape, Mender::person, ""},
-        {"a FIFO among containers",
-         [](Store& s) { ::mkfifo((files::path(s.data).parent_path() / "pipe").c_str(), 0644); }, wrongShape,
-         Mender::boot, "/pipe"},
-        {"a link for a class directory",
-         [](Store& s) { replaceByLink(files::path(s.data).parent_path(), s.data.c_str()); }, wrongShape, Mender::person,
+        {"a link for a subdirectory", [](S s) { replaceByLink(s.data + "/Library", "/"); }, wrongShape, person,
+         "/Library"},
+        {"a FIFO for a subdirectory", [](S s) { replaceByFifo(s.data + "/tmp"); }, wrongShape, person, "/tmp"},
+        {"a link for a container", [](S s) { replaceByLink(s.data, "/"); }, wrongShape, person},
+        {"a FIFO among containers", [](S s) { replaceByFifo(s.sibling("pipe")); }, wrongShape, boot, "/pipe"},
+        {"a link for a class directory", [](S s) { replaceByLink(s.classDirectory(), s.data); }, wrongShape, person,
          "/Data/Application"},
         {"a file for all of a user's containers",
-         [](Store& s) {
+         [](S s) {
              files::remove_all(s.world.path("private/var/second/Containers"));
              s.world.write("private/var/second/Containers", "x");
          },
-         wrongShape, Mender::person, "private/var/second/Containers"},
+         wrongShape, person, "private/var/second/Containers"},
         {"a link for staging",
-         [](Store& s) { replaceByLink(s.world.path(std::string(test::cachesPath) + "/Staging"), "/"); }, wrongShape,
-         Mender::person, "/Staging"},
-        {"a class that is not recorded",
-         [](Store& s) {
-             const platform::FileDescriptor file(::open((s.data + "/Documents").c_str(), O_RDONLY | O_CLOEXEC));
-             EXPECT_EQ(s.world.protection().setClass(file.get(), 1), 0);
-         },
-         protectionDiffers, Mender::person, "/Documents"},
-        {"a mapping to nothing",
-         [](Store& s) {
-             s.world.makeDirectories("run/zorvane/sandbox/501/1");
-             files::create_symlink(s.world.path("gone"), s.world.path("run/zorvane/sandbox/501/1/org.data"));
-         },
-         mappingDangling, Mender::launch, "sandbox/501/1/org.data"},
-        {"half a mapping",
-         [](Store& s) {
-             s.world.makeDirectories("run/zorvane/sandbox/501/1");
-             files::create_symlink(s.data, s.world.path("run/zorvane/sandbox/501/1/.new-0"));
-         },
-         writeLeftover, Mender::launch, "sandbox/501/1/.new-0"},
-        {"staging", [](Store& s) { leave(s, std::string("Staging/") + uuid); }, stagingLeftover, Mender::launch, uuid},
-        {"a copy in staging", [](Store& s) { leave(s, "Staging/.zorvaned-copy-abcdef"); }, copyLeftover, Mender::launch,
+         [](S s) { replaceByLink(s.world.path(std::string(test::cachesPath) + "/Staging"), "/"); }, wrongShape, person,
+         "/Staging"},
+        {"a class that is not recorded", [](S s) { s.setProtectionClass("/Documents"); }, protectionDiffers, person,
+         "/Documents"},
+        {"a mapping to nothing", [](S s) { s.map(s.world.path("gone"), "org.data"); }, mappingDangling, launch,
+         mapping + "org.data"},
+        {"half a mapping", [](S s) { s.map(s.data, ".new-0"); }, writeLeftover, launch, mapping + ".new-0"},
+        {"staging", [](S s) { s.leave(std::string("Staging/") + uuid); }, stagingLeftover, launch, uuid},
+        {"a copy in staging", [](S s) { s.leave("Staging/.zorvaned-copy-abcdef"); }, copyLeftover, launch,
          "/.zorvaned-copy-abcdef"},
-        {"a copy among containers",
-         [](Store& s) { files::create_directory(files::path(s.data).parent_path() / ".zorvaned-copy-abcdef"); },
-         copyLeftover, Mender::boot, "/.zorvaned-copy-abcdef"},
+        {"a copy among containers", [](S s) { files::create_directory(s.sibling(".zorvaned-copy-abcdef")); },
+         copyLeftover, boot, "/.zorvaned-copy-abcdef"},
         {"a copy beside the old location of bundles",
-         [](Store& s) { s.world.makeDirectories(std::string(test::mobileContainers) + "/.zorvaned-copy-abcdef"); },
-         copyLeftover, Mender::boot, "mobile/Containers/.zorvaned-copy-abcdef"},
-        {"a copy of transient containers", [](Store& s) { leave(s, ".zorvaned-copy-abcdef"); }, copyLeftover,
-         Mender::boot, "/.zorvaned-copy-abcdef"},
-        {"death row", [](Store& s) { leave(s, "Dead/temp.abcdef"); }, deathRowItem, Mender::daemon, "/temp.abcdef"},
-        {"no journal",
-         [](Store& s) { s.world.write(std::string(test::libraryPath) + "/Replace/" + uuid + ".plist", "x"); },
-         journalLeftover, Mender::launch, ".plist"},
-        {"half a journal",
-         [](Store& s) { s.world.write(std::string(test::libraryPath) + "/Replace/.A.plist.new-abcdef", "x"); },
-         writeLeftover, Mender::launch, ".new-abcdef"},
-        {"half an entitlement file",
-         [](Store& s) { s.world.write(std::string(test::libraryPath) + "/.zor_entitlements.plist.new-abcdef", "x"); },
-         writeLeftover, Mender::nextWrite, ".new-abcdef"},
-        {"half a metadata file",
-         [](Store& s) { std::ofstream(s.data + "/." + names::metadataFile + ".new-abcdef") << "x"; }, writeLeftover,
-         Mender::nextWrite, ".new-abcdef"},
-        {"half a subdirectory", [](Store& s) { files::create_directory(s.data + "/tmp.abcdef"); }, directoryLeftover,
-         Mender::person, "/tmp.abcdef"},
-        {"half a class directory",
-         [](Store& s) { files::create_directory(files::path(s.data).parent_path().string() + ".abcdef"); },
-         directoryLeftover, Mender::person, "/Application.abcdef"},
+         [](S s) { s.world.makeDirectories(std::string(test::mobileContainers) + "/.zorvaned-copy-abcdef"); },
+         copyLeftover, boot, "mobile/Containers/.zorvaned-copy-abcdef"},
+        {"a copy of transient containers", [](S s) { s.leave(".zorvaned-copy-abcdef"); }, copyLeftover, boot,
+         "/.zorvaned-copy-abcdef"},
+        {"death row", [](S s) { s.leave("Dead/temp.abcdef"); }, deathRowItem, Mender::daemon, "/temp.abcdef"},
+        {"no journal", [](S s) { s.write("Replace/" + std::string(uuid) + ".plist"); }, journalLeftover, launch,
+         ".plist"},
+        {"half a journal", [](S s) { s.write("Replace/.A.plist.new-abcdef"); }, writeLeftover, launch, ".new-abcdef"},
+        {"half an entitlement file", [](S s) { s.write(".zor_entitlements.plist.new-abcdef"); }, writeLeftover,
+         nextWrite, ".new-abcdef"},
+        {"half a metadata file", [](S s) { std::ofstream(s.data + "/." + names::metadataFile + ".new-abcdef") << "x"; },
+         writeLeftover, nextWrite, ".new-abcdef"},
+        {"half a subdirectory", [](S s) { files::create_directory(s.data + "/tmp.abcdef"); }, directoryLeftover, person,
+         "/tmp.abcdef"},
+        {"half a class directory", [](S s) { files::create_directory(s.classDirectory() + ".abcdef"); },
+         directoryLeftover, person, "/Application.abcdef"},
         {"nobody's system container",
-         [](Store& s) {
-             s.writeEntitlements(test::binary(plist::Dictionary{
-                 {"org.other",
-                  plist::Dictionary{
-                      {std::string(entitlementKeys::applicationGroups), plist::Array{plist::Value("group.a")}},
-                      {std::string(entitlementKeys::systemGroups), plist::Array{plist::Value("systemgroup.a")}}}}}));
+         [](S s) {
+             s.write(names::entitlementFile,
+                     test::binary(plist::Dictionary{{"org.other", entitlements("group.a", "systemgroup.a")}}));
          },
-         systemUnentitled, Mender::boot, ""},
-        {"nobody's group", [](Store& s) { s.create("group.b", ContainerClass::sharedAppGroup, 502); },
-         groupUnreferenced, Mender::boot, ""},
-        {"entitlements", [](Store& s) { s.writeEntitlements("x"); }, entitlementsUnreadable, Mender::launch,
+         systemUnentitled, boot},
+        {"nobody's group", [](S s) { s.create("group.b", ContainerClass::sharedAppGroup, 502); }, groupUnreferenced,
+         boot},
+        {"entitlements", [](S s) { s.write(names::entitlementFile); }, entitlementsUnreadable, launch,
          "/zor_entitlements.plist"},
-        {"lost entitlements",
-         [](Store& s) { s.world.write(std::string(test::libraryPath) + "/" + names::unreadableEntitlementFile, "x"); },
-         entitlementsAside, Mender::person, ".unreadable"},
+        {"lost entitlements", [](S s) { s.write(names::unreadableEntitlementFile); }, entitlementsAside, person,
+         ".unreadable"},
         {"a home that cannot be looked at",
-         [](Store& s) {
+         [](S s) {
              std::ofstream(s.world.path("etc/passwd"), std::ios::app)
                  << "third:x:504:504::/private/var/" + std::string(300, 'n') + ":/bin/sh\n";
          },
-         unexamined, Mender::person, "nnn"},
-        {"somebody's boot marker", [](Store& s) { s.world.bootMarker.state = {.present = false, .foreign = true}; },
-         bootMarkerForeign, Mender::launch, "sem.marker"},
+         unexamined, person, "nnn"},
+        {"somebody's boot marker", [](S s) { s.world.bootMarker.state = {.present = false, .foreign = true}; },
+         bootMarkerForeign, launch, "sem.marker"},
     };
     return rows;
 }
@@ -288,15 +262,11 @@ TEST(StoreCheckTest, FindsWhatChangedItsOwner) {
 // pending change, a container under a well-known name, a missing marker without and with a daemon.
 TEST(StoreCheckTest, KnowsWhatIsNoFault) {
     Store store;
-    const plist::Dictionary wants{
-        {std::string(entitlementKeys::applicationGroups), plist::Array{plist::Value("group.new")}},
-        {std::string(entitlementKeys::systemContainer), true}};
-    ASSERT_TRUE(
-        store.world.services().entitlements()._setEntitlementDictionaryValues({wants}, {"com.veltra.settingsd"}));
+    store.registerOwner("com.veltra.settingsd",
+                        {{std::string(entitlementKeys::applicationGroups), plist::Array{plist::Value("group.new")}}});
     store.create("com.veltra.settingsd", ContainerClass::dataSystem, 499);
     ASSERT_EQ(store.world.sandbox.setMapping(501, platform::SandboxItemType::dataContainer, "org.data", store.data), 0);
-    const platform::FileDescriptor file(::open((store.data + "/tmp").c_str(), O_RDONLY | O_CLOEXEC));
-    ASSERT_EQ(store.world.protection().setClass(file.get(), 1), 0);
+    store.setProtectionClass("/tmp");
     CheckOptions options{.changingProtection = {store.dataUuid}, .pause = std::chrono::milliseconds(0)};
     const auto findings = store.check(options);
     ASSERT_EQ(findings.size(), 1U) << textOf(findings);
@@ -326,10 +296,8 @@ TEST(StoreCheckTest, ReportsNothingOfWhatIsInFlight) {
                 store.create(identifier, ContainerClass::dataApplication, 501, true);
             }
         });
-    for (int round = 0; round < 5; ++round) {
-        const auto findings = store.check({.daemonServes = true});
-        EXPECT_EQ(textOf(findings), "");
-    }
+    for (int round = 0; round < 5; ++round)
+        EXPECT_EQ(textOf(store.check({.daemonServes = true})), "");
     stop = true;
     for (std::thread& thread : threads)
         thread.join();
@@ -345,8 +313,8 @@ TEST(StoreCheckTest, MakesOneStepForEachContainer) {
     const std::string path = store.create(identifier, ContainerClass::dataApplication, 501);
     files::remove_all(path + "/Documents");
     files::remove_all(path + "/tmp");
-    leave(store, "Dead/temp.abcdef");
-    leave(store, "Dead/temp.abcdeg");
+    store.leave("Dead/temp.abcdef");
+    store.leave("Dead/temp.abcdeg");
     const auto steps = repairSteps(store.check(), "/a root");
     ASSERT_EQ(steps.size(), 2U);
     EXPECT_EQ(steps[0].act, RepairStep::Act::recreateStructure);

@@ -18,6 +18,7 @@
 #include <fcntl.h>
 #include <filesystem>
 #include <fstream>
+#include <map>
 #include <memory>
 #include <set>
 #include <sstream>
@@ -70,18 +71,25 @@ public:
         }
         ::chmod(directory_.path().c_str(), 0755);
         outside_ = outside();
+        empty_ = content();
     }
 
     [[nodiscard]] std::string path(const std::string& below) const { return directory_.path() + below; }
-    /// Everything but the container and the source.
-    [[nodiscard]] std::string outside() const {
-        return zor::support::readTree(directory_.path(), {"container", "source", "archive"}).describe();
-    }
     [[nodiscard]] bool isDamaged() const { return outside() != outside_; }
-    [[nodiscard]] std::string content() const {
-        return zor::support::readTree(path("/container"), {metadata}).describe();
+    /// Nothing of what was refused shows in the container, and nothing outside it changed.
+    void expectRefused(const Outcome<Progress>& outcome, const std::string& why) const {
+        ASSERT_FALSE(outcome);
+        EXPECT_NE(outcome.error().what.find(why), std::string::npos) << outcome.error().what;
+        EXPECT_FALSE(isDamaged());
+        EXPECT_EQ(content(), empty_);
     }
 
+    /// Of an item in the container.
+    [[nodiscard]] struct stat statusOf(const std::string& name) const {
+        struct stat status{};
+        EXPECT_EQ(::lstat(path("/container/" + name).c_str(), &status), 0) << name;
+        return status;
+    }
     Outcome<Progress> put(const std::string& source) {
         zor::platform::LinuxDisk disk(zor::platform::Syncs::off);
         return put(source, disk);
@@ -99,83 +107,67 @@ public:
     }
 
 private:
+    /// Everything but the container and the source.
+    [[nodiscard]] std::string outside() const {
+        return zor::support::readTree(directory_.path(), {"container", "source", "archive"}).describe();
+    }
+    /// What shows in the container: ".install-" is closed to its owner.
+    [[nodiscard]] std::string content() const {
+        std::string shown;
+        std::istringstream lines(zor::support::readTree(path("/container"), {metadata}).describe());
+        for (std::string line; std::getline(lines, line);)
+            if (line.find(".install-") == line.npos)
+                shown += line + "\n";
+        return shown;
+    }
     zor::support::TemporaryDirectory directory_;
     std::string outside_;
+    std::string empty_;
 };
-
-/// Nothing of what was refused shows in the container, and nothing outside it changed.
-void expectRefused(World& world, const std::string& before, const Outcome<Progress>& outcome, const std::string& why) {
-    ASSERT_FALSE(outcome);
-    EXPECT_NE(outcome.error().what.find(why), std::string::npos) << outcome.error().what;
-    EXPECT_FALSE(world.isDamaged());
-    std::string now;
-    std::istringstream lines(world.content());
-    for (std::string line; std::getline(lines, line);)
-        if (line.find(".install-") == line.npos) // closed to the container's owner
-            now += line + "\n";
-    EXPECT_EQ(now, before);
-}
 
 // Goal: no archive makes root write outside the container, give powers, or leave half of itself in sight. Method: a
 // table of archives, each refused with its reason; the tree around the container stays as it was.
 TEST(Content, HostileArchives) {
+    using Archive = std::vector<Made>;
     const std::string name255(255, 'n');
-    struct Row {
-        std::vector<Made> entries;
+    const std::string meta = metadata;
+    const struct {
         const char* why;
-        Form form = Form::tar;
-    };
-    const std::vector<Row> rows = {
-        {{file("/outside/file")}, "absolute"},
-        {{file("../outside/file")}, "leads up"},
-        {{file("a/../../outside/file")}, "leads up"},
-        {{directory("a/..")}, "leads up"},
-        {{file("../outside/file")}, "leads up", Form::zip},
-        {{file("../outside/file")}, "leads up", Form::cpio},
-        {{file("../outside/file")}, "leads up", Form::sevenZip},
-        {{file(metadata)}, "metadata"},
-        {{file("./" + std::string(metadata))}, "metadata"},
-        {{file(std::string(metadata) + "/x")}, "metadata"},
-        {{directory("a"), symbolicLink(metadata, "a")}, "metadata"},
-        {{file("a", "x", 04755)}, "set-user-ID"},
-        {{file("a", "x", 02755)}, "set-group-ID"},
-        {{file("a", "x", 04755)}, "set-user-ID", Form::zip},
-        {{{.name = "a", .mode = S_IFCHR | 0666}}, "a device"},
-        {{{.name = "a", .mode = S_IFBLK | 0666}}, "a device"},
-        {{{.name = "a", .mode = S_IFIFO | 0666}}, "a FIFO"},
-        {{{.name = "a", .mode = S_IFSOCK | 0666}}, "a socket", Form::cpio},
-        {{symbolicLink("a", "/outside")}, "absolute path"},
-        {{symbolicLink("a", "../outside")}, "leads out"},
-        {{directory("a"), symbolicLink("a/b", "../../outside")}, "leads out"},
-        {{symbolicLink("a", "/outside")}, "absolute path", Form::zip},
+        std::vector<Archive> archives;
+        std::vector<Form> forms = {Form::tar};
+    } rows[] = {
+        {"absolute", {{file("/outside/file")}}},
+        {"leads up", {{file("../outside/file")}}, {Form::tar, Form::zip, Form::cpio, Form::sevenZip}},
+        {"leads up", {{file("a/../../outside/file")}, {directory("a/..")}}},
+        {"metadata",
+         {{file(meta)}, {file("./" + meta)}, {file(meta + "/x")}, {directory("a"), symbolicLink(meta, "a")}}},
+        {"set-user-ID", {{file("a", "x", 04755)}}, {Form::tar, Form::zip}},
+        {"set-group-ID", {{file("a", "x", 02755)}}},
+        {"a device", {{{.name = "a", .mode = S_IFCHR | 0666}}, {{.name = "a", .mode = S_IFBLK | 0666}}}},
+        {"a FIFO", {{{.name = "a", .mode = S_IFIFO | 0666}}}},
+        {"a socket", {{{.name = "a", .mode = S_IFSOCK | 0666}}}, {Form::cpio}},
+        {"absolute path", {{symbolicLink("a", "/outside")}}, {Form::tar, Form::zip}},
+        {"leads out", {{symbolicLink("a", "../outside")}, {directory("a"), symbolicLink("a/b", "../../outside")}}},
+        {"leads out", {{hardLink("a", "/outside/file")}, {hardLink("a", "../outside/file")}}},
         // The first link leads nowhere but here, so ".." behind it would lead out.
-        {{symbolicLink("here", "."), symbolicLink("out", "here/../outside")}, "behind a name"},
-        {{directory("d"), symbolicLink("l", "d"), file("l/f")}, "no directory"},
-        {{symbolicLink("l", "."), directory("l")}, "comes twice"},
-        {{symbolicLink("l", "f"), file("l")}, "comes twice"},
-        {{file("f"), file("f", "y")}, "comes twice"},
-        {{file("f"), file("./f", "y")}, "comes twice"},
-        {{file("f"), directory("f")}, "comes twice"},
-        {{directory("f"), file("f")}, "comes twice"},
-        {{file("f"), file("f/g")}, "no directory"},
-        {{hardLink("a", "/outside/file")}, "leads out"},
-        {{hardLink("a", "../outside/file")}, "leads out"},
-        {{hardLink("a", "b"), file("b")}, "no file earlier"},
-        {{symbolicLink("l", "f"), hardLink("a", "l")}, "no file earlier"},
-        {{directory("d"), hardLink("a", "d")}, "no file earlier"},
-        {{hardLink("a", metadata)}, "no file earlier"},
-        {{file(name255 + "n")}, "more than 255"},
-        {{file(repeated("dir/", 1100) + "f")}, "more than 4095"},
-        {{file(".")}, "only be a directory"},
-        {{hardLink("./", "f")}, "only be a directory"},
+        {"behind a name", {{symbolicLink("here", "."), symbolicLink("out", "here/../outside")}}},
+        {"no directory", {{directory("d"), symbolicLink("l", "d"), file("l/f")}, {file("f"), file("f/g")}}},
+        {"comes twice", {{symbolicLink("l", "."), directory("l")}, {symbolicLink("l", "f"), file("l")}}},
+        {"comes twice", {{file("f"), file("f", "y")}, {file("f"), file("./f", "y")}}},
+        {"comes twice", {{file("f"), directory("f")}, {directory("f"), file("f")}}},
+        {"no file earlier", {{hardLink("a", "b"), file("b")}, {symbolicLink("l", "f"), hardLink("a", "l")}}},
+        {"no file earlier", {{directory("d"), hardLink("a", "d")}, {hardLink("a", meta)}}},
+        {"more than 255", {{file(name255 + "n")}}},
+        {"more than 4095", {{file(repeated("dir/", 1100) + "f")}}},
+        {"only be a directory", {{file(".")}, {hardLink("./", "f")}}},
     };
-    for (const Row& row : rows) {
-        SCOPED_TRACE(::testing::PrintToString(static_cast<int>(row.form)) + " " + row.entries.back().name + " -> " +
-                     row.entries.back().target + ": " + row.why);
-        World world;
-        const std::string before = world.content();
-        expectRefused(world, before, world.putArchive(makeArchive(row.form, row.entries)), row.why);
-    }
+    for (const auto& row : rows)
+        for (const Form form : row.forms)
+            for (const Archive& archive : row.archives) {
+                SCOPED_TRACE(archive.back().name + " -> " + archive.back().target + ": " + row.why);
+                World world;
+                world.expectRefused(world.putArchive(makeArchive(form, archive)), row.why);
+            }
 }
 
 // Goal: what is no archive, is cut or is damaged is refused, wherever that is. Method: such bytes, and a good archive
@@ -185,39 +177,33 @@ TEST(Content, BrokenArchives) {
     for (unsigned i = 0; i < 20'000; ++i)
         noise += static_cast<char>((i * i * 7919) >> 5);
     const std::vector<Made> entries = {directory("a"), file("a/f", std::string(3000, 'f')), file("g", noise)};
-    struct Row {
-        std::string what;
-        std::string bytes;
-    };
-    std::vector<Row> rows = {{"nothing", ""},
-                             {"text", "Just some text.\n"},
-                             // A list of files that a reader would fetch.
-                             {"mtree", "#mtree\na type=file contents=/etc/passwd\n"}};
-    for (const auto& [name, form] : std::initializer_list<std::pair<std::string, Form>>{{"tar", Form::tar},
-                                                                                        {"tar.gz", Form::tarGzip},
-                                                                                        {"tar.xz", Form::tarXz},
-                                                                                        {"tar.zst", Form::tarZstd},
-                                                                                        {"zip", Form::zip},
-                                                                                        {"cpio", Form::cpio},
-                                                                                        {"7z", Form::sevenZip}}) {
+    std::vector<std::pair<std::string, std::string>> rows = {{"nothing", ""},
+                                                             {"text", "Just some text.\n"},
+                                                             // A list of files that a reader would fetch.
+                                                             {"mtree", "#mtree\na type=file contents=/etc/passwd\n"}};
+    for (const Form form :
+         {Form::tar, Form::tarGzip, Form::tarXz, Form::tarZstd, Form::zip, Form::cpio, Form::sevenZip}) {
         const std::string whole = makeArchive(form, entries);
+        const std::string name = "form " + std::to_string(static_cast<int>(form));
+        const auto cutAt = [&](std::size_t at) {
+            rows.emplace_back(name + " cut at " + std::to_string(at), whole.substr(0, at));
+        };
         // A tar's end is its last two blocks; of those one may be missing.
         for (std::size_t cut = 512; form == Form::tar && cut + 1024 < whole.size(); cut += 512)
-            rows.push_back({name + " cut at " + std::to_string(cut), whole.substr(0, cut)});
+            cutAt(cut);
         for (std::size_t cut = 16; cut + 16 < whole.size(); cut += whole.size() / 9)
-            rows.push_back({name + " cut at " + std::to_string(cut), whole.substr(0, cut)});
+            cutAt(cut);
         std::string damaged = whole;
         damaged[damaged.size() / 2] ^= 0x55;
         // The others have no sums of data, or none when they are made this way.
         if (form != Form::tar && form != Form::cpio && form != Form::tarZstd)
-            rows.push_back({name + " damaged", damaged});
+            rows.emplace_back(name + " damaged", damaged);
     }
     const zor::support::ProcessResources before;
-    for (const Row& row : rows) {
-        SCOPED_TRACE(row.what);
+    for (const auto& [what, bytes] : rows) {
+        SCOPED_TRACE(what);
         World world;
-        const std::string empty = world.content();
-        expectRefused(world, empty, world.putArchive(row.bytes), "");
+        world.expectRefused(world.putArchive(bytes), "");
     }
     const std::string member = makeArchive(Form::tarGzip, entries);
     World world; // as two that were put one behind the other, and padded
@@ -237,58 +223,41 @@ TEST(Content, GoodArchives) {
           Form::tarLzma, Form::tarXz, Form::tarZstd, Form::zip, Form::cpio, Form::sevenZip}) {
         SCOPED_TRACE(static_cast<int>(form));
         const bool isTar = form != Form::zip && form != Form::cpio && form != Form::sevenZip;
-        std::vector<Made> entries = {directory("."),
-                                     directory("./a", 0500),
-                                     file("./a/f", "text", 0444),
-                                     directory("./a", 0500),
-                                     file("implied/b/run", "#!", 0755),
-                                     symbolicLink("implied/up", "../../implied/b/../b/run"),
-                                     file("large", large),
-                                     file("empty", ""),
-                                     symbolicLink("Library", "a"),
-                                     file("Documents/n\n\x01", "x")};
-        entries[5].target = "../a/f";
+        std::vector<Made> entries = {directory("."), directory("./a", 0500), file("./a/f", "text", 0444),
+                                     // Twice.
+                                     directory("./a", 0500), file("implied/b/run", "#!", 0755),
+                                     symbolicLink("implied/up", "../a/f"), file("large", large), file("empty", ""),
+                                     symbolicLink("Library", "a"), file("Documents/n\n\x01", "x")};
+        std::map<std::string, std::string> contents = {
+            {"a/f", "text"},       {"large", large},           {"implied/up", "text"},   {"empty", ""},
+            {"Library/f", "text"}, {"Documents/n\n\x01", "x"}, {metadata, "whose it is"}};
         if (isTar) {
-            entries.push_back(hardLink("./again", "./a/f"));
-            entries.push_back(file("\xff\xfe", "no text"));
-            entries.push_back(symbolicLink("longLink", longName));
-            entries.push_back(file(longName, "long"));
+            for (Made& more : std::vector{hardLink("./again", "./a/f"), file("\xff\xfe", "no text"),
+                                          symbolicLink("longLink", longName), file(longName, "long")})
+                entries.push_back(more);
+            contents.merge(
+                std::map<std::string, std::string>{{"again", "text"}, {"\xff\xfe", "no text"}, {"longLink", "long"}});
         }
-        if (form == Form::tar)
+        if (form == Form::tar) {
             entries.push_back({.name = "sparse", .data = "end", .hole = 40'000'000});
+            contents["sparse"] = std::string(40'000'000, '\0') + "end";
+        }
         World world;
         const auto outcome = world.putArchive(makeArchive(form, entries));
         ASSERT_TRUE(outcome) << outcome.error().what;
         EXPECT_FALSE(world.isDamaged());
-        const std::string root = world.path("/container/");
-        const auto read = [&](const std::string& name) {
-            std::ifstream stream(root + name, std::ios::binary);
-            return std::string(std::istreambuf_iterator<char>(stream), {});
-        };
-        EXPECT_EQ(read("a/f"), "text");
-        EXPECT_TRUE(read("large") == large);
-        EXPECT_EQ(read("implied/up"), "text");
-        EXPECT_EQ(read("Library/f"), "text");
-        EXPECT_EQ(read("Documents/n\n\x01"), "x");
-        EXPECT_EQ(read(metadata), "whose it is");
-        struct stat status{};
-        ASSERT_EQ(::lstat((root + "a").c_str(), &status), 0);
-        EXPECT_EQ(status.st_mode & 07777, 0700U) << "its owner may use each of the directories";
-        ASSERT_EQ(::lstat((root + "a/f").c_str(), &status), 0);
-        EXPECT_EQ(status.st_mode & 07777, 0444U);
-        EXPECT_EQ(status.st_mtime, 1'000'000'000);
-        EXPECT_EQ(status.st_nlink, isTar ? 2U : 1U);
-        ASSERT_EQ(::lstat((root + "empty").c_str(), &status), 0);
-        EXPECT_EQ(status.st_size, 0);
-        if (isTar) {
-            EXPECT_EQ(read("again"), "text");
-            EXPECT_EQ(read("\xff\xfe"), "no text");
-            EXPECT_EQ(read("longLink"), "long");
+        for (const auto& [name, content] : contents) {
+            std::ifstream stream(world.path("/container/") + name, std::ios::binary);
+            const std::string read{std::istreambuf_iterator<char>(stream), {}};
+            EXPECT_TRUE(stream && read == content) << name;
         }
+        EXPECT_EQ(world.statusOf("a").st_mode & 07777, 0700U) << "its owner may use each of the directories";
+        const struct stat file = world.statusOf("a/f");
+        EXPECT_EQ(file.st_mode & 07777, 0444U);
+        EXPECT_EQ(file.st_mtime, 1'000'000'000);
+        EXPECT_EQ(file.st_nlink, isTar ? 2U : 1U);
         if (form == Form::tar) {
-            EXPECT_TRUE(read("sparse") == std::string(40'000'000, '\0') + "end");
-            ASSERT_EQ(::lstat((root + "sparse").c_str(), &status), 0);
-            EXPECT_LT(status.st_blocks * 512, 1'000'000) << "a hole stays one";
+            EXPECT_LT(world.statusOf("sparse").st_blocks * 512, 1'000'000) << "a hole stays one";
         }
         for (const auto& [id, inode] : zor::support::readTree(world.path("/container"), {metadata}).inodes)
             EXPECT_EQ(inode.uid, ::geteuid() == 0 ? ownerId : ::geteuid());
@@ -297,51 +266,45 @@ TEST(Content, GoodArchives) {
 
 // Goal: a directory as the source is judged like an archive. Method: one wrong item in it, deep enough to be met late.
 TEST(Content, HostileDirectories) {
-    struct Row {
-        const char* what;
-        std::function<void(const std::string& folder)> make;
+    const struct {
         const char* why;
+        std::function<void(const std::string& folder)> make;
         bool rootOnly = false;
-    };
-    const std::vector<Row> rows = {
+    } rows[] = {
         {"set-user-ID",
          [](const std::string& folder) {
              writeFile(folder + "/x", "x");
              ::chmod((folder + "/x").c_str(), 04755);
-         },
-         "set-user-ID"},
-        {"FIFO", [](const std::string& folder) { ::mkfifo((folder + "/x").c_str(), 0600); }, "a FIFO"},
-        {"device", [](const std::string& folder) { ::mknod((folder + "/x").c_str(), S_IFCHR | 0666, makedev(1, 3)); },
-         "a device", true},
-        {"link out", [](const std::string& folder) { (void)!::symlink("../../../x", (folder + "/x").c_str()); },
-         "leads out"},
-        {"metadata", [](const std::string& folder) { writeFile(folder + "/../../" + metadata, "forged"); }, "metadata"},
-        {"mount", [](const std::string& folder) { ::mount("none", folder.c_str(), "tmpfs", 0, ""); },
-         "another file system", true},
+         }},
+        {"a FIFO", [](const std::string& folder) { ::mkfifo((folder + "/x").c_str(), 0600); }},
+        {"a device", [](const std::string& folder) { ::mknod((folder + "/x").c_str(), S_IFCHR | 0666, makedev(1, 3)); },
+         true},
+        {"leads out", [](const std::string& folder) { (void)!::symlink("../../../x", (folder + "/x").c_str()); }},
+        {"metadata", [](const std::string& folder) { writeFile(folder + "/../../" + metadata, "forged"); }},
+        {"another file system", [](const std::string& folder) { ::mount("none", folder.c_str(), "tmpfs", 0, ""); },
+         true},
     };
-    for (const Row& row : rows) {
-        SCOPED_TRACE(row.what);
+    for (const auto& row : rows) {
+        SCOPED_TRACE(row.why);
         if (row.rootOnly && ::geteuid() != 0)
             continue;
         World world;
-        const std::string before = world.content();
-        for (const char* folder : {"/source/a", "/source/a/b"})
-            ::mkdir(world.path(folder).c_str(), 0755);
-        row.make(world.path("/source/a/b"));
-        expectRefused(world, before, world.put("/source"), row.why);
-        ::umount2(world.path("/source/a/b").c_str(), MNT_DETACH);
+        const std::string folder = world.path("/source/a/b");
+        std::filesystem::create_directories(folder);
+        row.make(folder);
+        world.expectRefused(world.put("/source"), row.why);
+        ::umount2(folder.c_str(), MNT_DETACH);
     }
     World world;
-    const std::string before = world.content();
-    expectRefused(world, before, world.put(""), "holds the container itself");
+    world.expectRefused(world.put(""), "holds the container itself");
 }
 
 // Goal: a directory comes in as it is, but as the container's. Method: what may be in one, compared item by item.
 TEST(Content, GoodDirectories) {
     World world;
     const std::string root = world.path("/source");
-    for (const char* folder : {"/a", "/a/b", "/Documents"})
-        ::mkdir((root + folder).c_str(), 0755);
+    for (const char* folder : {"/a/b", "/Documents"})
+        std::filesystem::create_directories(root + folder);
     writeFile(root + "/a/b/f", std::string(100'000, 'f'));
     writeFile(root + "/Documents/\n", "x");
     ASSERT_EQ(::link((root + "/a/b/f").c_str(), (root + "/again").c_str()), 0);
@@ -358,12 +321,9 @@ TEST(Content, GoodDirectories) {
         return tree.describe();
     };
     EXPECT_EQ(describe(world.path("/container")), describe(root));
-    struct stat status{};
-    ASSERT_EQ(::lstat(world.path("/container/again").c_str(), &status), 0);
-    EXPECT_LT(status.st_blocks * 512, 1'000'000) << "a hole stays one";
-    if (::geteuid() == 0) {
-        EXPECT_EQ(status.st_uid, ownerId);
-    }
+    const struct stat again = world.statusOf("again");
+    EXPECT_LT(again.st_blocks * 512, 1'000'000) << "a hole stays one";
+    EXPECT_EQ(again.st_uid, ::geteuid() == 0 ? ownerId : ::geteuid());
 }
 
 // Goal: whatever a decoder that was taken over sends, the writer stays in its directory and ends. Method: records that
@@ -372,12 +332,18 @@ TEST(Content, NonsenseRecords) {
     const auto bytes = [](const Record& record, const std::string& after = "") {
         return std::string(reinterpret_cast<const char*>(&record), sizeof record) + after;
     };
+    const auto data = [&](const std::string& content, std::int64_t offset = 0) {
+        const auto length = static_cast<std::uint32_t>(content.size());
+        return bytes({.kind = RecordKind::data, .first = length, .offset = offset}, content);
+    };
     const auto entry = [&](const std::string& name, const std::string& target, Record record) {
         record.kind = RecordKind::entry;
         record.first = static_cast<std::uint32_t>(name.size());
         record.second = static_cast<std::uint32_t>(target.size());
         return bytes(record, name + target);
     };
+    const std::string withNul("f\0g", 3);
+    const std::string end = bytes({.kind = RecordKind::end});
     const std::string file = entry("f", "", {.flags = recordHasSize, .mode = S_IFREG | 0644, .offset = 4});
     const std::vector<std::pair<std::string, const char*>> rows = {
         {"", "too early"},
@@ -388,21 +354,15 @@ TEST(Content, NonsenseRecords) {
         {bytes({.kind = RecordKind::entry, .first = 0xFFFF'FFFF}), "nonsense"},
         {bytes({.kind = RecordKind::entry, .first = 200'000, .second = 200'000}), "nonsense"},
         {bytes({.kind = RecordKind::data, .first = 1, .second = 1}), "nonsense"},
-        {bytes({.kind = RecordKind::data, .first = 1}, "x"), "data of no file"},
-        {entry("d", "", {.mode = S_IFDIR | 0755}) + bytes({.kind = RecordKind::data, .first = 1}, "x"),
-         "data of no file"},
-        {file + bytes({.kind = RecordKind::data, .first = 1, .offset = -1}, "x"), "out of order"},
-        {file + bytes({.kind = RecordKind::data, .first = 1, .offset = INT64_MAX}, "x"), "out of order"},
-        {file + bytes({.kind = RecordKind::data, .first = 5}, "12345") + bytes({.kind = RecordKind::end}),
-         "longer than it says"},
-        {file + bytes({.kind = RecordKind::data, .first = 1, .offset = 1}, "x") +
-             bytes({.kind = RecordKind::data, .first = 1}, "x"),
-         "out of order"},
-        {entry("f", "", {.flags = recordHasSize, .mode = S_IFREG | 0644, .offset = -5}) +
-             bytes({.kind = RecordKind::end}),
-         "longer than it says"},
-        {entry(std::string("f\0g", 3), "", {.mode = S_IFREG | 0644}), "NUL"},
-        {entry("l", std::string("f\0g", 3), {.mode = S_IFLNK | 0777}), "NUL"},
+        {data("x"), "data of no file"},
+        {entry("d", "", {.mode = S_IFDIR | 0755}) + data("x"), "data of no file"},
+        {file + data("x", -1), "out of order"},
+        {file + data("x", INT64_MAX), "out of order"},
+        {file + data("x", 1) + data("x"), "out of order"},
+        {file + data("12345") + end, "longer than it says"},
+        {entry("f", "", {.flags = recordHasSize, .mode = S_IFREG | 0644, .offset = -5}) + end, "longer than it says"},
+        {entry(withNul, "", {.mode = S_IFREG | 0644}), "NUL"},
+        {entry("l", withNul, {.mode = S_IFLNK | 0777}), "NUL"},
         {entry("l", "", {.mode = S_IFLNK | 0777}), "without a target"},
         {entry("x", "", {.mode = 0xFFFF'FFFF}), "refused"},
         {entry("", "", {.mode = S_IFREG}), "no name"},
@@ -539,10 +499,9 @@ TEST(Content, Bombs) {
         GTEST_SKIP() << "mounts are not permitted here";
     {
         World world(directory.path());
-        const std::string before = world.content();
         const std::string bomb = makeArchive(Form::tarZstd, {file("zeros", std::string(80'000'000, '\0'))});
         ASSERT_LT(bomb.size(), 100'000U);
-        expectRefused(world, before, world.putArchive(bomb), "too little space");
+        world.expectRefused(world.putArchive(bomb), "too little space");
     }
     ::umount2(directory.path().c_str(), MNT_DETACH);
 }
@@ -601,13 +560,15 @@ TEST(Content, EveryCallFailsAndThePowerGoes) {
 }
 
 /// Puts a directory that somebody else filled where the new content's was just made.
-class SwappingDisk : public zor::support::FaultDisk {
+class SwappingDisk final : public zor::support::InterceptedDisk {
 public:
-    using FaultDisk::FaultDisk;
-    int makeDirectory(int directory, const char* name, mode_t mode) override {
-        const int made = FaultDisk::makeDirectory(directory, name, mode);
-        if (std::string(name).starts_with(".install-")) {
-            EXPECT_EQ(::renameat2(directory, "closed", directory, name, RENAME_EXCHANGE), 0);
+    using InterceptedDisk::InterceptedDisk;
+
+protected:
+    ssize_t intercept(const zor::support::DiskCallInfo& info, const Make& make) override {
+        const ssize_t made = make();
+        if (info.call == zor::support::DiskCall::makeDirectory && info.subject.starts_with(".install-")) {
+            EXPECT_EQ(::renameat2(info.fd, "closed", info.fd, info.subject.c_str(), RENAME_EXCHANGE), 0);
         }
         return made;
     }

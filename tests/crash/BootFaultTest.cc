@@ -5,6 +5,7 @@
 #include "entitlements/ZOREntitlementMapping.h"
 #include "plist/Binary.h"
 #include "support/FaultLoop.h"
+#include "support/Files.h"
 #include "support/PowerCut.h"
 #include "support/ProcessResources.h"
 
@@ -12,7 +13,6 @@
 #include <fstream>
 #include <gtest/gtest.h>
 #include <sstream>
-#include <stdexcept>
 #include <unistd.h>
 
 namespace zor::support {
@@ -38,8 +38,8 @@ const Kind data = {2, 501, 501, {"Documents", "Library", "Library/Caches", "Libr
 const Kind system = {12, 499, 0, {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp"}, 0777};
 
 void give(const files::path& path, std::uint32_t owner) {
-    if (::geteuid() == 0 && ::lchown(path.c_str(), owner, owner) != 0)
-        throw std::runtime_error("cannot give away " + path.string());
+    if (::geteuid() == 0)
+        checked(::lchown(path.c_str(), owner, owner), "chown " + path.string());
 }
 
 void put(const files::path& path, const Kind& kind, const std::string& identifier, const plist::Dictionary& info = {}) {
@@ -64,7 +64,7 @@ void put(const files::path& path, const Kind& kind, const std::string& identifie
     give(path / "content", kind.owner);
 }
 
-std::string bytesOf(const files::path& path) {
+std::string textOf(const files::path& path) {
     std::ostringstream text;
     text << std::ifstream(path, std::ios::binary).rdbuf();
     return text.str();
@@ -75,13 +75,12 @@ struct OldDevice {
         device.marker.make();
         device.start(disk, journalEverywhere);
         const std::string key(entitlementKeys::systemContainer);
-        if (!device.daemon->composition().entitlements()._setEntitlementDictionaryValues(
-                {plist::Dictionary{{key, true}}}, {"com.veltra.settingsd"}))
-            throw std::runtime_error("no entitlements");
+        EXPECT_TRUE(device.daemon->entitlements()._setEntitlementDictionaryValues({plist::Dictionary{{key, true}}},
+                                                                                  {"com.veltra.settingsd"}));
         device.daemon.reset();
         const files::path var = device.root.path() + "/private/var";
         put(var / "mobile/Containers/Bundle/Application" / bundleUuid, bundle, "com.example.bundle");
-        bundleRecord = bytesOf(var / "mobile/Containers/Bundle/Application" / bundleUuid / metadataName);
+        bundleRecord = textOf(var / "mobile/Containers/Bundle/Application" / bundleUuid / metadataName);
         put(var / "mobile/Containers/Data/Application" / dataUuid, data, "com.example.data",
             {{"com.veltra.Brevance.GroupContainerIDs", plist::Array{"group.old"}}});
         put(var / "containers/Data/System" / wellknownUuid, system, "com.veltra.settingsd");
@@ -108,16 +107,16 @@ std::uint64_t changesOf(StoreDaemon& daemon) {
 enum class Bundle { known, inPlace };
 std::string judgeMigrated(const std::string& root, StoreDaemon& daemon, Bundle expected) {
     const files::path var = root + "/private/var";
-    if (bytesOf(var / "containers/Bundle/Application" / bundleUuid / "content") != "com.example.bundle" ||
+    if (textOf(var / "containers/Bundle/Application" / bundleUuid / "content") != "com.example.bundle" ||
         files::exists(var / "mobile/Containers/Bundle"))
         return "the bundle is not where it belongs";
-    if (bytesOf(var / "containers/Data/System/com.veltra.settingsd/content") != "com.veltra.settingsd")
+    if (textOf(var / "containers/Data/System/com.veltra.settingsd/content") != "com.veltra.settingsd")
         return "the well-known container is not under its name";
     if (files::exists(var / "containers/Data/System" / unentitledUuid))
         return "an unentitled system container is still there";
     if (files::exists(var / "mobile/Containers/Data/Application/Junk"))
         return "an orphan is still there";
-    const auto groups = daemon.composition().entitlements().appGroupIdentifiersForIdentifier("com.example.data");
+    const auto groups = daemon.entitlements().appGroupIdentifiersForIdentifier("com.example.data");
     if (!groups || *groups != std::vector<std::string>{"group.old"})
         return "the group identifiers are lost";
     std::vector<Request> known = {{"com.example.data", ContainerClass::dataApplication, 501},
@@ -137,7 +136,7 @@ Bundle expectationAfter(const OldDevice& old, const FaultOutcome& outcome) {
     const bool done = files::exists(var / "root/Library/Zorvane/zor_bundle_migration_complete.plist");
     const files::path place = var / "containers/Bundle/Application" / bundleUuid;
     struct stat status{};
-    const bool asItWas = bytesOf(place / metadataName) == old.bundleRecord ||
+    const bool asItWas = textOf(place / metadataName) == old.bundleRecord ||
                          (::lstat(place.c_str(), &status) == 0 && status.st_uid == bundle.owner);
     const bool oneError = !outcome.stopped && outcome.fault.span == FaultSpan::once;
     return done && asItWas && oneError ? Bundle::inPlace : Bundle::known;
@@ -145,7 +144,7 @@ Bundle expectationAfter(const OldDevice& old, const FaultOutcome& outcome) {
 
 /// Of a boot that finishes the migration, and one that finds nothing to do.
 std::string judgeNextBoots(const std::string& root, Bundle expected) {
-    platform::LinuxDisk disk;
+    platform::LinuxDisk disk{platform::Syncs::off};
     MemoryBootMarker marker;
     for (const bool isLast : {false, true}) {
         marker.forget();
@@ -181,11 +180,7 @@ TEST(BootFaultTest, TheNextBootFinishesIt) {
         platform::LinuxDisk linuxDisk;
         const LoopReport report = forEachFaultPoint(
             linuxDisk, fault, [](FaultDisk& disk) { return std::make_unique<OldDevice>(disk); },
-            [](const std::unique_ptr<OldDevice>& old) {
-                old->device.daemon = std::make_unique<StoreDaemon>(old->device.root.path(), old->device.marker,
-                                                                   old->disk, journalEverywhere);
-                old->device.daemon->launch();
-            },
+            [](const std::unique_ptr<OldDevice>& old) { old->device.start(old->disk, journalEverywhere); },
             [](const std::unique_ptr<OldDevice>& old, const FaultOutcome& outcome) { return judge(*old, outcome); });
         EXPECT_EQ(report.complaint, "");
         EXPECT_GT(report.examined, 30U);

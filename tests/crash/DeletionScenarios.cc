@@ -5,44 +5,29 @@
 
 #include <algorithm>
 #include <memory>
-#include <stdexcept>
 
 namespace zor::support {
 
 namespace {
 
-constexpr std::uint32_t mobileUser = 501;
-constexpr std::uint32_t systemUser = 499;
 const std::string app = "com.example.app";
 
-ErrorCode registerApp(Device& device, const std::string& identifier, const plist::Dictionary& entitlements,
-                      const plist::Dictionary& options = {}) {
-    return device.daemon->composition().entitlements().processEntitlements(&entitlements, &identifier, &options);
+bool registerApp(Device& device, const std::string& identifier, const plist::Dictionary& entitlements,
+                 const plist::Dictionary& options = {}) {
+    const ErrorCode code = device.daemon->entitlements().processEntitlements(&entitlements, &identifier, &options);
+    return code == ErrorCode::success;
 }
 
-void mustSucceed(ErrorCode code) {
-    if (code != ErrorCode::success)
-        throw std::runtime_error("a registration before the first fault failed");
+void mustRegister(Device& device, const std::string& identifier, const plist::Dictionary& entitlements,
+                  const plist::Dictionary& options = {}) {
+    must(registerApp(device, identifier, entitlements, options), "a registration before the first fault failed");
 }
 
 plist::Dictionary groupsAndSystemContainer() {
-    return {{std::string(entitlementKeys::applicationGroups), plist::Array{"group.app"}},
-            {std::string(entitlementKeys::systemGroups), plist::Array{"systemgroup.app"}},
-            {std::string(entitlementKeys::systemContainer), true}};
+    return entitlements({"group.app"}, {"systemgroup.app"}, true);
 }
 
 using Victims = std::vector<Acknowledged>;
-
-Victims makeVictims(Device& device, const std::vector<Request>& requests) {
-    Victims victims;
-    for (const Request& request : requests) {
-        const auto made = device.daemon->create(request);
-        if (!made.acknowledged)
-            throw std::runtime_error("no victim");
-        victims.push_back(*made.acknowledged);
-    }
-    return victims;
-}
 
 /// An error may leave a container where it is, which is logged and no failure. What counts is what the daemon says.
 bool saysTheyAreGone(Device& device, const std::vector<Request>& requests) {
@@ -52,10 +37,8 @@ bool saysTheyAreGone(Device& device, const std::vector<Request>& requests) {
 
 /// What was acknowledged as gone is gone; anything else is whole or gone, and can be had again.
 std::string judgeGone(const std::string& root, bool acted, const std::vector<Request>& requests) {
-    MemoryBootMarker marker;
-    marker.make();
-    platform::LinuxDisk disk;
-    StoreDaemon daemon(root, marker, disk, journalEverywhere);
+    LaterDaemon later(root);
+    StoreDaemon& daemon = later.daemon;
     for (const Request& request : requests) {
         const auto found = daemon.lookUp(request);
         if (acted && found.acknowledged)
@@ -68,21 +51,28 @@ std::string judgeGone(const std::string& root, bool acted, const std::vector<Req
     return "";
 }
 
-Scenario going(const std::string& name, const std::vector<Request>& victims, std::function<void(Device&)> prepare,
-               std::function<bool(Device&)> act) {
+/// `act` does to the victims what takes them away, and says whether that was acknowledged.
+Scenario going(const std::string& name, const std::vector<Request>& requests,
+               const std::function<void(Device&)>& prepare,
+               const std::function<bool(Device&, const Victims& victims)>& act) {
+    const auto victims = std::make_shared<Victims>();
     return {.name = name,
             .prepare =
-                [prepare = std::move(prepare)](Device& device) {
+                [=](Device& device) {
                     device.create({"com.example.first", ContainerClass::dataApplication, mobileUser});
                     prepare(device);
+                    victims->clear();
+                    for (const Request& request : requests)
+                        victims->push_back(device.mustCreate(request));
                 },
-            .act = [act = std::move(act),
-                    victims](Device& device) { device.acted = act(device) && saysTheyAreGone(device, victims); },
+            .act = [=](Device& device) { device.acted = act(device, *victims) && saysTheyAreGone(device, requests); },
             .requests = {},
             .pointsMin = 2,
             .callsPerStateMax = 2,
-            .also = [victims](const std::string& root, bool acted) { return judgeGone(root, acted, victims); }};
+            .also = [=](const std::string& root, bool acted) { return judgeGone(root, acted, requests); }};
 }
+
+void prepareNothing(Device&) {}
 
 /// The first of them, in one batch.
 bool stage(Device& device, const Victims& victims, std::size_t count) {
@@ -94,49 +84,40 @@ bool stage(Device& device, const Victims& victims, std::size_t count) {
         batch.identifiers.emplace_back(victim.request.identifier);
         batch.classes.emplace_back(static_cast<std::uint64_t>(victim.request.containerClass));
     }
-    return static_cast<bool>(device.daemon->composition().sharedClientConnection()->stageForDeleteContainersWithUsers(
-        batch, UseLocking::yes));
+    return device.client().stageForDeleteContainersWithUsers(batch, UseLocking::yes).has_value();
 }
 
 Scenario deletion() {
     const Request victim{"victim", ContainerClass::dataApplication, mobileUser};
-    return going(
-        "deletion", {victim}, [victim](Device& device) { (void)makeVictims(device, {victim}); },
-        [victim](Device& device) {
-            const auto deleted = device.daemon->composition().sharedClientConnection()->deleteContainerForUser(
-                victim.userId, &victim.identifier, victim.containerClass, false);
-            return deleted || deleted.error().is(ErrorCode::notFound);
-        });
+    return going("deletion", {victim}, prepareNothing, [victim](Device& device, const Victims&) {
+        const auto deleted =
+            device.client().deleteContainerForUser(victim.userId, &victim.identifier, victim.containerClass, false);
+        return deleted || deleted.error().is(ErrorCode::notFound);
+    });
 }
 
 Scenario deletionOfMany() {
     std::vector<Request> all;
     for (const char* identifier : {"victim.a", "victim.b", "victim.c"})
         all.push_back({identifier, ContainerClass::dataApplication, mobileUser});
-    const auto victims = std::make_shared<Victims>();
-    return going(
-        "deletion of many", all, [victims, all](Device& device) { *victims = makeVictims(device, all); },
-        [victims](Device& device) { return stage(device, *victims, victims->size()); });
+    return going("deletion of many", all, prepareNothing,
+                 [](Device& device, const Victims& victims) { return stage(device, victims, victims.size()); });
 }
 
 /// The bundle is the last that refers to one group, its child to another.
 Scenario deletionOfABundle() {
-    const std::vector<Request> named = {{app, ContainerClass::bundleApplication, 33},
-                                        {app, ContainerClass::dataApplication, mobileUser}};
-    std::vector<Request> all = {{"group.app", ContainerClass::sharedAppGroup, mobileUser},
-                                {"systemgroup.child", ContainerClass::sharedSystemGroup, systemUser}};
-    all.insert(all.begin(), named.begin(), named.end());
-    const auto victims = std::make_shared<Victims>();
     return going(
-        "deletion of a bundle", all,
-        [victims, all](Device& device) {
-            mustSucceed(registerApp(device, app, groupsAndSystemContainer()));
-            mustSucceed(registerApp(device, "com.example.child",
-                                    {{std::string(entitlementKeys::systemGroups), plist::Array{"systemgroup.child"}}},
-                                    {{std::string(ipc::keys::parentBundleIdOption), app}}));
-            *victims = makeVictims(device, all);
+        "deletion of a bundle",
+        {{app, ContainerClass::bundleApplication, bundleUser},
+         {app, ContainerClass::dataApplication, mobileUser},
+         {"group.app", ContainerClass::sharedAppGroup, mobileUser},
+         {"systemgroup.child", ContainerClass::sharedSystemGroup, systemUser}},
+        [](Device& device) {
+            mustRegister(device, app, groupsAndSystemContainer());
+            mustRegister(device, "com.example.child", entitlements({}, {"systemgroup.child"}),
+                         {{std::string(ipc::keys::parentBundleIdOption), app}});
         },
-        [victims, count = named.size()](Device& device) { return stage(device, *victims, count); });
+        [](Device& device, const Victims& victims) { return stage(device, victims, 2); });
 }
 
 /// A registration that drops the last references and the system container.
@@ -146,21 +127,14 @@ Scenario release() {
                                           {"systemgroup.app", ContainerClass::sharedSystemGroup, systemUser}};
     Scenario scenario = going(
         "release by a registration", victims,
-        [victims](Device& device) {
-            mustSucceed(registerApp(device, app, groupsAndSystemContainer()));
-            (void)makeVictims(device, victims);
-        },
-        [](Device& device) { return registerApp(device, app, {{"k", 1}}) == ErrorCode::success; });
+        [](Device& device) { mustRegister(device, app, groupsAndSystemContainer()); },
+        [](Device& device, const Victims&) { return registerApp(device, app, {{"k", 1}}); });
     scenario.also = [judge = scenario.also](const std::string& root, bool acted) -> std::string {
         std::string complaint = judge(root, acted);
-        MemoryBootMarker marker;
-        marker.make();
-        platform::LinuxDisk disk;
-        StoreDaemon daemon(root, marker, disk, journalEverywhere);
-        ZOREntitlementMapping& mapping = daemon.composition().entitlements();
-        if (complaint.empty() && !mapping.entitlementsExistForIdentifier(app))
+        LaterDaemon later(root);
+        if (complaint.empty() && !later.daemon.entitlements().entitlementsExistForIdentifier(app))
             complaint = "the registration is lost";
-        if (complaint.empty() && acted && mapping.identifierHasSystemContainer(app))
+        if (complaint.empty() && acted && later.daemon.entitlements().identifierHasSystemContainer(app))
             complaint = "the registration was acknowledged and is undone";
         return complaint;
     };
@@ -174,24 +148,16 @@ Scenario firstUseOfGroups() {
     return {
         .name = "first use of groups",
         .prepare =
-            [](Device& device) {
-                mustSucceed(
-                    registerApp(device, app,
-                                {{std::string(entitlementKeys::applicationGroups), plist::Array{"group.a", "group.b"}},
-                                 {std::string(entitlementKeys::systemGroups), plist::Array{"systemgroup.a"}}}));
-            },
+            [](Device& device) { mustRegister(device, app, entitlements({"group.a", "group.b"}, {"systemgroup.a"})); },
         .act =
             [requests](Device& device) {
                 Composition& composition = device.daemon->composition();
                 for (const Request& request : requests) {
                     const auto paths = composition.groups().groupContainerPathsForUser(
                         request.userId, *composition.sharedClientConnection(), &app);
-                    const auto path =
-                        paths ? paths->find(request.identifier) : ZORGroupManager::Paths::const_iterator();
-                    if (!paths || path == paths->end())
+                    if (!paths || !paths->contains(request.identifier))
                         continue;
-                    const auto found = device.daemon->lookUp(request);
-                    add(device.promised, {request, path->second, found.acknowledged ? found.acknowledged->uuid : ""});
+                    device.promise(request, paths->at(request.identifier));
                 }
             },
         .requests = requests};
@@ -200,11 +166,8 @@ Scenario firstUseOfGroups() {
 } // namespace
 
 std::vector<Scenario> deletionScenarios() {
-    return {deletion(), deletionOfMany(), deletionOfABundle(), release(), firstUseOfGroups()};
-}
-
-std::vector<Scenario> deletionScenariosAtHome() {
-    return {deletion(), deletionOfABundle(), release(), firstUseOfGroups()};
+    return {atHome(deletion()), deletionOfMany(), atHome(deletionOfABundle()), atHome(release()),
+            atHome(firstUseOfGroups())};
 }
 
 } // namespace zor::support

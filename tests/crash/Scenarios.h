@@ -8,8 +8,19 @@
 
 namespace zor::support {
 
+inline constexpr std::uint32_t mobileUser = 501;
+inline constexpr std::uint32_t bundleUser = 33;
+inline constexpr std::uint32_t systemUser = 499;
+
+/// Of an application.
+plist::Dictionary entitlements(plist::Array appGroups, plist::Array systemGroups = {}, bool systemContainer = false);
+
+/// Ends a test whose start could not be made.
+void must(bool happened, const char* what);
+
 struct Scenario {
     std::string name;
+    bool worksAtHome = false;
     /// Runs before the first fault or cut, on a launched daemon. What it puts into `promised` stays promised.
     std::function<void(Device&)> prepare;
     /// Puts what was acknowledged into `promised`.
@@ -34,16 +45,18 @@ struct Scenario {
     std::function<std::string(const std::string& root, bool acted)> also;
 };
 
-/// Creation in each group of classes, transient creation again, death row, the entitlement file and the launch.
+/// Creation in each group of classes, transient creation again, death row, the entitlement file, the launch and
+/// upcalls.
 std::vector<Scenario> storeScenarios();
-/// Those that work in the user's home.
-std::vector<Scenario> homeScenarios();
 /// What changes a container that is there.
 std::vector<Scenario> changeScenarios();
-std::vector<Scenario> changeScenariosAtHome();
-/// Deletion, the loss of last references, and the first use of groups. They work in the user's home too.
+/// Deletion, the loss of last references, and the first use of groups.
 std::vector<Scenario> deletionScenarios();
-std::vector<Scenario> deletionScenariosAtHome();
+/// All of them, or those that work in the user's home.
+std::vector<Scenario> allScenarios();
+std::vector<Scenario> homeScenarios();
+/// `scenario`, as one of these.
+Scenario atHome(Scenario scenario);
 /// As test names are spelled.
 std::string scenarioName(const ::testing::TestParamInfo<Scenario>& parameter);
 

@@ -75,6 +75,7 @@ std::string judge(FaultWorld& world, const Scenario& scenario, const FaultOutcom
 }
 
 void loopOverFaults(const std::string& parent, Home home, const Scenario& scenario, const Fault& fault) {
+    SCOPED_TRACE(fault.describe());
     platform::LinuxDisk linuxDisk;
     const LoopReport report = forEachFaultPoint(
         linuxDisk, fault, [&](FaultDisk& disk) { return makeWorld(parent, home, scenario, fault.kind, disk); },
@@ -101,10 +102,8 @@ const std::vector<Fault> faults = {
 class StoreFaultTest : public ::testing::TestWithParam<Scenario> {};
 
 TEST_P(StoreFaultTest, StandsEveryFault) {
-    for (const Fault& fault : faults) {
-        SCOPED_TRACE(fault.describe());
+    for (const Fault& fault : faults)
         loopOverFaults("/dev/shm", Home::onRoot, GetParam(), fault);
-    }
 }
 
 // The same with the user's home on a file system of its own, where a move is a copy and a removal.
@@ -114,7 +113,6 @@ TEST_P(HomeFaultTest, StandsEveryFaultBetweenFileSystems) {
     if (!homesCanBeMounted())
         GTEST_SKIP() << "skipped: only root may mount a home";
     for (const Fault& fault : faults) {
-        SCOPED_TRACE(fault.describe());
         if (fault.kind != FaultKind::exit && fault.error != EACCES)
             loopOverFaults("/dev/shm", Home::mounted, GetParam(), fault);
     }
@@ -125,12 +123,8 @@ TEST_P(StoreFaultTest, StandsEveryStopOnDisk) {
     loopOverFaults("/var/tmp", Home::onRoot, GetParam(), {.kind = FaultKind::stop});
 }
 
-INSTANTIATE_TEST_SUITE_P(ChangeAtHome, HomeFaultTest, ::testing::ValuesIn(changeScenariosAtHome()), scenarioName);
-INSTANTIATE_TEST_SUITE_P(Change, StoreFaultTest, ::testing::ValuesIn(changeScenarios()), scenarioName);
-INSTANTIATE_TEST_SUITE_P(DeletionAtHome, HomeFaultTest, ::testing::ValuesIn(deletionScenariosAtHome()), scenarioName);
-INSTANTIATE_TEST_SUITE_P(Deletion, StoreFaultTest, ::testing::ValuesIn(deletionScenarios()), scenarioName);
+INSTANTIATE_TEST_SUITE_P(Store, StoreFaultTest, ::testing::ValuesIn(allScenarios()), scenarioName);
 INSTANTIATE_TEST_SUITE_P(Home, HomeFaultTest, ::testing::ValuesIn(homeScenarios()), scenarioName);
-INSTANTIATE_TEST_SUITE_P(Store, StoreFaultTest, ::testing::ValuesIn(storeScenarios()), scenarioName);
 
 } // namespace
 } // namespace zor::support

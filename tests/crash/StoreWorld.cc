@@ -3,11 +3,13 @@
 
 #include "check/StoreCheck.h"
 #include "daemon/Daemon.h"
+#include "support/Files.h"
 #include "support/ProcessResources.h"
 
 #include <algorithm>
 #include <fstream>
 #include <sched.h>
+#include <sstream>
 #include <stdexcept>
 #include <sys/mount.h>
 #include <sys/stat.h>
@@ -101,24 +103,43 @@ std::string judgeRequests(StoreDaemon& daemon, const std::string& root, std::vec
     return judgeAtRest(root, promised, leftovers);
 }
 
+/// What a user would be told of a store that was launched: nothing, but what the next boot or write clears, and empty
+/// directories that never got their names.
+std::string judgeByCheck(const std::string& root, const platform::BootMarker& marker) {
+    const auto system = check::CheckedSystem::open(root);
+    if (!system)
+        return "the store cannot be checked: " + system.error();
+    for (const check::Finding& finding : check::checkStore(
+             **system, {.daemonServes = true, .pause = std::chrono::milliseconds(0), .bootMarker = &marker})) {
+        const bool allowed = finding.mender == check::Mender::boot || finding.mender == check::Mender::nextWrite ||
+                             finding.code == check::FindingCode::directoryLeftover;
+        if (!allowed && !check::pageOf(finding.code).isNote)
+            return "the check finds " + std::string(check::pageOf(finding.code).word) + " at " + finding.path + ": " +
+                   finding.what;
+    }
+    return "";
+}
+
 } // namespace
 
-void MemoryLog::write(int level, std::string_view function, std::string_view message) {
-    constexpr std::size_t textBytesMax = 20'000;
-    text += "\n    <" + std::to_string(level) + "> " + std::string(function) + ": " + std::string(message);
-    if (text.size() > textBytesMax)
-        text.erase(0, text.size() - textBytesMax);
+std::string StoreDaemon::log() {
+    constexpr std::size_t linesMax = 200;
+    const std::vector<LogLine> lines = log_.take();
+    std::ostringstream text;
+    for (std::size_t i = lines.size() > linesMax ? lines.size() - linesMax : 0; i < lines.size(); ++i)
+        text << "\n    " << lines[i];
+    return text.str();
 }
 
 void furnishRoot(const std::string& root) {
-    for (const char* directory : {"etc", "tmp", "private", "private/var", "private/var/mobile", "private/var/brevad"}) {
-        if (::mkdir((root + "/" + directory).c_str(), 0755) != 0)
-            throw std::runtime_error(std::string("cannot make ") + directory);
+    const platform::FileDescriptor top = openDirectory(root);
+    for (const char* directory : {"etc", "tmp", "private", "private/var", "private/var/mobile", "private/var/brevad"})
+        makeDirectory(top.get(), directory);
+    checked(::fchmod(top.get(), 0755), "chmod");
+    if (::geteuid() == 0) {
+        checked(::fchownat(top.get(), "private/var/mobile", 501, 501, 0), "chown");
+        checked(::fchownat(top.get(), "private/var/brevad", 33, 33, 0), "chown");
     }
-    ::chmod(root.c_str(), 0755);
-    if (::geteuid() == 0 && (::chown((root + "/private/var/mobile").c_str(), 501, 501) != 0 ||
-                             ::chown((root + "/private/var/brevad").c_str(), 33, 33) != 0))
-        throw std::runtime_error("cannot give homes to their users");
     std::ofstream(root + "/etc/passwd") << "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
 }
 
@@ -155,7 +176,7 @@ void StoreDaemon::launch() {
 }
 
 StoreDaemon::Answer StoreDaemon::ask(const Request& request, bool createIfNecessary) {
-    const auto found = composition_->sharedClientConnection()->createOrLookupContainerForUser(
+    const auto found = client().createOrLookupContainerForUser(
         request.userId, &request.identifier, request.containerClass,
         {.createIfNecessary = createIfNecessary, .transient = request.transient});
     if (!found)
@@ -189,33 +210,24 @@ void Device::start(platform::Disk& onDisk, fs::Durability::Probe probe) {
     daemon->launch();
 }
 
+Acknowledged Device::mustCreate(const Request& request) const {
+    const auto answer = daemon->create(request);
+    if (!answer.acknowledged)
+        throw std::runtime_error("cannot create " + request.identifier + daemon->log());
+    return *answer.acknowledged;
+}
+
+void Device::promise(const Request& request, const std::string& path) {
+    const auto found = daemon->lookUp(request);
+    add(promised, {request, path, found.acknowledged ? found.acknowledged->uuid : ""});
+}
+
 bool Device::create(const Request& request) {
     const auto answer = daemon->create(request);
     if (answer.acknowledged)
         add(promised, *answer.acknowledged);
     return answer.acknowledged.has_value();
 }
-
-namespace {
-
-/// What a user would be told of a store that was launched: nothing, but what the next boot or write clears, and empty
-/// directories that never got their names.
-std::string judgeByCheck(const std::string& root, const platform::BootMarker& marker) {
-    const auto system = check::CheckedSystem::open(root);
-    if (!system)
-        return "the store cannot be checked: " + system.error();
-    for (const check::Finding& finding : check::checkStore(
-             **system, {.daemonServes = true, .pause = std::chrono::milliseconds(0), .bootMarker = &marker})) {
-        const bool allowed = finding.mender == check::Mender::boot || finding.mender == check::Mender::nextWrite ||
-                             finding.code == check::FindingCode::directoryLeftover;
-        if (!allowed && !check::pageOf(finding.code).isNote)
-            return "the check finds " + std::string(check::pageOf(finding.code).word) + " at " + finding.path + ": " +
-                   finding.what;
-    }
-    return "";
-}
-
-} // namespace
 
 std::string judgeAfterRestart(const std::string& root, platform::BootMarker& marker, fs::Durability::Probe probe,
                               const std::vector<Acknowledged>& promised, const std::vector<Request>& requests,
@@ -230,7 +242,7 @@ std::string judgeAfterRestart(const std::string& root, platform::BootMarker& mar
         std::erase_if(kept, [](const Acknowledged& one) { return one.request.transient; });
     const ProcessResources before;
     {
-        platform::LinuxDisk disk;
+        platform::LinuxDisk disk{platform::Syncs::off};
         StoreDaemon daemon(root, marker, disk, probe);
         daemon.launch();
         if (std::string complaint = judgeAtRest(root, kept, leftovers); !complaint.empty())

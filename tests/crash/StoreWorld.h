@@ -9,6 +9,7 @@
 #include "daemon/Composition.h"
 #include "platform/linux/LinuxDisk.h"
 #include "platform/linux/LinuxPlatform.h"
+#include "support/RecordingLog.h"
 #include "support/StoreJudge.h"
 
 #include <memory>
@@ -19,6 +20,7 @@ namespace zor::support {
 /// What a boot keeps in memory.
 class MemoryBootMarker final : public platform::BootMarker {
 public:
+    explicit MemoryBootMarker(bool present = false) : present_(present) {}
     [[nodiscard]] State look() const override { return {.present = present_, .foreign = false}; }
     int make() override {
         present_ = true;
@@ -28,20 +30,7 @@ public:
     [[nodiscard]] std::string name() const override { return "memory"; }
 
 private:
-    bool present_ = false;
-};
-
-/// The last lines, for a test that fails.
-class MemoryLog final : public platform::PlatformLog {
-public:
-    bool open(std::string_view, int) override { return true; }
-    [[nodiscard]] bool isOpen() const override { return true; }
-    [[nodiscard]] int level() const override { return 5; }
-    void enableDiskLogging(const std::string&, unsigned, std::size_t) override {}
-    void write(int level, std::string_view function, std::string_view message) override;
-    void writeToSystemLog(int, std::string_view) override {}
-
-    std::string text;
+    bool present_;
 };
 
 class ImmediateQueue final : public platform::WorkQueue {
@@ -90,18 +79,29 @@ public:
     Answer lookUp(const Request& request) { return ask(request, false); }
 
     [[nodiscard]] Composition& composition() { return *composition_; }
-    [[nodiscard]] const std::string& log() const { return log_.text; }
+    [[nodiscard]] ZORClientConnection& client() { return *composition_->sharedClientConnection(); }
+    [[nodiscard]] ZOREntitlementMapping& entitlements() { return composition_->entitlements(); }
+    /// Its latest lines since the last call, for a test that fails.
+    [[nodiscard]] std::string log();
 
 private:
     Answer ask(const Request& request, bool createIfNecessary);
 
     const std::string root_;
-    MemoryLog log_;
+    RecordingLog log_{logLevelNotice};
     ImmediateQueue queue_;
     std::unique_ptr<platform::LinuxPlatform> platform_;
     platform::XattrProtectionClass protection_;
     platform::LinkSandboxUserState sandbox_;
     std::unique_ptr<Composition> composition_;
+};
+
+/// A daemon over a store that is at rest, to be asked what only a client can see.
+struct LaterDaemon {
+    explicit LaterDaemon(const std::string& root) : daemon(root, marker, disk, journalEverywhere) {}
+    MemoryBootMarker marker{true};
+    platform::LinuxDisk disk{platform::Syncs::off};
+    StoreDaemon daemon;
 };
 
 /// Where private/var/mobile lies: on the root's file system, or on one mounted there (in a mount namespace of this
@@ -116,6 +116,11 @@ struct Device {
     void start(platform::Disk& onDisk, fs::Durability::Probe probe);
     /// Creates a container and notes it as promised. False when the daemon did not.
     bool create(const Request& request);
+    /// The same without a promise; what is done to it takes it away or changes its place. Throws when it cannot.
+    Acknowledged mustCreate(const Request& request) const;
+    /// Promises a path that was answered. What the daemon does not find there is promised too, and missed.
+    void promise(const Request& request, const std::string& path);
+    [[nodiscard]] ZORClientConnection& client() const { return daemon->client(); }
 
     TemporaryDirectory root;
     const Home home;

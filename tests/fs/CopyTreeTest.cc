@@ -9,14 +9,15 @@
 #include "support/FaultLoop.h"
 #include "support/ProcessResources.h"
 
-#include <array>
+#include <algorithm>
 #include <atomic>
-#include <chrono>
 #include <fcntl.h>
+#include <filesystem>
 #include <functional>
 #include <gtest/gtest.h>
 #include <linux/posix_acl.h>
 #include <linux/posix_acl_xattr.h>
+#include <map>
 #include <memory>
 #include <sys/stat.h>
 #include <sys/xattr.h>
@@ -26,15 +27,8 @@
 namespace zor::fs::test {
 namespace {
 
-using platform::FileDescriptor;
-using support::TemporaryDirectory;
-
 constexpr const char* accessAcl = "system.posix_acl_access";
 constexpr const char* defaultAcl = "system.posix_acl_default";
-
-bool isRoot() {
-    return ::geteuid() == 0;
-}
 
 std::string attribute(const std::string& path, const char* name) {
     std::string value(65536, '\0');
@@ -60,12 +54,6 @@ bool setAttribute(const std::string& path, const char* name, const std::string& 
     return ::lsetxattr(path.c_str(), name, value.data(), value.size(), 0) == 0;
 }
 
-struct stat statusOf(const std::string& path) {
-    struct stat status{};
-    EXPECT_EQ(::lstat(path.c_str(), &status), 0) << path;
-    return status;
-}
-
 /// Times of an item and of all it may hold are made the same in both trees by whoever made them.
 void setOldTimes(const std::string& path) {
     const timespec times[2] = {{1'000'000'000, 123'456'789}, {900'000'000, 987'654'321}};
@@ -78,30 +66,61 @@ bool hasOldTimes(const std::string& path) {
            status.st_atim.tv_nsec == 123'456'789 && status.st_mtim.tv_nsec == 987'654'321;
 }
 
-struct FidelityCase {
-    const char* name;
-    /// Makes the item, a file, directory or other, at the path; false when the file system or the user cannot.
-    std::function<bool(const std::string& path)> make;
-    /// Judges the copy beyond what is compared for every case: kind, mode (with the bits below), owner, times, content.
-    std::function<void(const std::string& from, const std::string& to)> check = nullptr;
-    mode_t modeBitsDropped = 0;
-};
+using Make = std::function<bool(const std::string& path)>;
+using Attributes = std::map<std::string, std::string>;
 
-bool makeModeFile(const std::string& path, mode_t mode) {
-    makeFile(AT_FDCWD, path, "content of " + path.substr(path.rfind('/')), mode);
+bool setAttributes(const std::string& path, const Attributes& attributes) {
+    return std::ranges::all_of(attributes,
+                               [&](const auto& one) { return setAttribute(path, one.first.c_str(), one.second); });
+}
+
+Make file(mode_t mode, const Attributes& attributes = {}) {
+    return [=](const std::string& path) {
+        makeFile(AT_FDCWD, path, "content of " + path.substr(path.rfind('/')), mode);
+        return setAttributes(path, attributes);
+    };
+}
+
+Make directoryOf(const std::vector<std::string>& files, mode_t mode = 0755, const Attributes& attributes = {}) {
+    return [=](const std::string& path) {
+        makeDirectory(AT_FDCWD, path);
+        for (const std::string& name : files)
+            makeFile(AT_FDCWD, path + "/" + name);
+        return ::chmod(path.c_str(), mode) == 0 && setAttributes(path, attributes);
+    };
+}
+
+Make link(const std::string& target) {
+    return [=](const std::string& path) { return ::symlink(target.c_str(), path.c_str()) == 0; };
+}
+
+Make owned(const Make& make) {
+    return [=](const std::string& path) { return make(path) && ::lchown(path.c_str(), 501, 502) == 0; };
+}
+
+Make sparse(off_t length, const std::vector<off_t>& dataAt) {
+    return [=](const std::string& path) {
+        const FileDescriptor fd(::open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0644));
+        for (const off_t at : dataAt)
+            EXPECT_EQ(::pwrite(fd.get(), "data", 4, at), 4);
+        return ::ftruncate(fd.get(), length) == 0;
+    };
+}
+
+bool makeLarge(const std::string& path) {
+    std::string content;
+    for (int i = 0; i < 300'000; ++i)
+        content += std::to_string(i);
+    makeFile(AT_FDCWD, path, content);
     return true;
 }
 
-void checkAttribute(const char* name, const std::string& from, const std::string& to) {
-    EXPECT_NE(attribute(from, name), "") << name;
-    EXPECT_EQ(attribute(from, name), attribute(to, name)) << name;
-}
-
-bool makeSparse(const std::string& path, off_t length, const std::vector<off_t>& dataAt) {
-    const FileDescriptor fd(::open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0644));
-    for (const off_t at : dataAt)
-        EXPECT_EQ(::pwrite(fd.get(), "data", 4, at), 4);
-    return ::ftruncate(fd.get(), length) == 0;
+bool makeHardLinks(const std::string& path) {
+    directoryOf({"one"})(path);
+    makeDirectory(AT_FDCWD, path + "/sub");
+    for (const char* other : {"/two", "/sub/three", "-outside"})
+        std::filesystem::create_hard_link(path + "/one", path + other);
+    return true;
 }
 
 void checkSparse(const std::string& from, const std::string& to) {
@@ -110,129 +129,56 @@ void checkSparse(const std::string& from, const std::string& to) {
     EXPECT_LE(statusOf(to).st_blocks, statusOf(from).st_blocks + slackBlocks);
 }
 
+struct FidelityCase {
+    const char* name;
+    /// Makes the item, a file, directory or other, at the path; false when the file system or the user cannot.
+    Make make;
+    /// Judges the copy beyond what is compared for every case: kind, mode (with the bits below), owner, times,
+    /// attributes, access lists, content.
+    std::function<void(const std::string& from, const std::string& to)> check = nullptr;
+    mode_t modeBitsDropped = 0;
+};
+
 const std::vector<FidelityCase>& fidelityCases() {
     constexpr off_t megabyte = 1024 * 1024;
+    // Revision 2, effective, one capability.
+    static const std::string capability = {1, 0, 0, 2, 0, 0x20, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0};
     static const std::vector<FidelityCase> cases = {
         {"empty file", [](const auto& path) { return ::mknod(path.c_str(), S_IFREG | 0644, 0) == 0; }},
-        {"mode 0000", [](const auto& path) { return makeModeFile(path, 0000) && isRoot(); }},
-        {"mode 0751", [](const auto& path) { return makeModeFile(path, 0751); }},
-        {.name = "set-user-ID",
-         .make = [](const auto& path) { return makeModeFile(path, 04755); },
-         .modeBitsDropped = 06000},
-        {.name = "set-group-ID",
-         .make = [](const auto& path) { return makeModeFile(path, 02755); },
-         .modeBitsDropped = 06000},
-        {"directory with sticky and set-group-ID",
-         [](const auto& path) {
-             makeDirectory(AT_FDCWD, path, 03770);
-             return makeModeFile(path + "/file", 0600);
-         }},
-        {"directory without write permission",
-         [](const auto& path) {
-             makeDirectory(AT_FDCWD, path);
-             makeFile(AT_FDCWD, path + "/file");
-             return ::chmod(path.c_str(), 0555) == 0;
-         },
-         [](const auto&, const auto& to) { EXPECT_TRUE(exists(AT_FDCWD, to + "/file")); }},
-        {"another owner",
-         [](const auto& path) {
-             makeFile(AT_FDCWD, path, "theirs", 0640);
-             return ::chown(path.c_str(), 501, 502) == 0;
-         }},
-        {"link of another owner",
-         [](const auto& path) {
-             makeLink(AT_FDCWD, path, "no where");
-             return ::lchown(path.c_str(), 501, 502) == 0;
-         }},
-        {"dangling link", [](const auto& path) { return ::symlink("no where", path.c_str()) == 0; }},
-        {"longest link", [](const auto& path) { return ::symlink(std::string(4095, 'x').c_str(), path.c_str()) == 0; }},
+        {"mode 0000", [](const auto& path) { return ::geteuid() == 0 && file(0000)(path); }},
+        {"mode 0751", file(0751)},
+        {"set-user-ID", file(04755), nullptr, 06000},
+        {"set-group-ID", file(02755), nullptr, 06000},
+        {"directory with sticky and set-group-ID", directoryOf({"file"}, 03770)},
+        {"directory without write permission", directoryOf({"file"}, 0555)},
+        {"another owner", owned(file(0640))},
+        {"link of another owner", owned(link("no where"))},
+        {"dangling link", link("no where")},
+        {"longest link", link(std::string(4095, 'x'))},
         {"FIFO", [](const auto& path) { return ::mkfifo(path.c_str(), 0620) == 0; }},
         {"attributes of a file",
-         [](const auto& path) {
-             makeFile(AT_FDCWD, path, "x", 0444);
-             return setAttribute(path, "user.some", "value") && setAttribute(path, "user.empty", "") &&
-                    setAttribute(path, "user.long", std::string(2000, 'v'));
-         },
-         [](const auto& from, const auto& to) {
-             checkAttribute("user.some", from, to);
-             checkAttribute("user.long", from, to);
-             EXPECT_EQ(::lgetxattr(to.c_str(), "user.empty", nullptr, 0), 0);
-         }},
-        {"protection class",
-         [](const auto& path) {
-             makeFile(AT_FDCWD, path);
-             return setAttribute(path, "trusted.zorvane.protection", "2");
-         },
-         [](const auto& from, const auto& to) { checkAttribute("trusted.zorvane.protection", from, to); }},
-        {"file capabilities",
-         [](const auto& path) {
-             makeFile(AT_FDCWD, path, "x", 0755);
-             // Revision 2, effective, one capability.
-             const char value[20] = {1, 0, 0, 2, 0, 0x20};
-             return setAttribute(path, "security.capability", std::string(value, sizeof value));
-         },
+         file(0444, {{"user.some", "value"}, {"user.empty", ""}, {"user.long", std::string(2000, 'v')}})},
+        {"protection class", file(0644, {{"trusted.zorvane.protection", "2"}})},
+        {"file capabilities", file(0755, {{"security.capability", capability}}),
          [](const auto&, const auto& to) { EXPECT_EQ(attribute(to, "security.capability"), ""); }},
-        {"access list of a file",
-         [](const auto& path) {
-             makeFile(AT_FDCWD, path);
-             return setAttribute(path, accessAcl, aclFor1234());
-         },
-         [](const auto& from, const auto& to) { checkAttribute(accessAcl, from, to); }},
-        {"default access list of a directory",
-         [](const auto& path) {
-             makeDirectory(AT_FDCWD, path);
-             makeFile(AT_FDCWD, path + "/without");
-             return setAttribute(path, defaultAcl, aclFor1234());
-         },
-         [](const auto& from, const auto& to) {
-             checkAttribute(defaultAcl, from, to);
-             EXPECT_EQ(attribute(to + "/without", accessAcl), "");
-         }},
+        {"access list of a file", file(0644, {{accessAcl, aclFor1234()}})},
+        {"default access list of a directory", directoryOf({"without"}, 0755, {{defaultAcl, aclFor1234()}}),
+         [](const auto&, const auto& to) { EXPECT_EQ(attribute(to + "/without", accessAcl), ""); }},
         {"holes in front, between and behind",
-         [](const auto& path) {
-             return makeSparse(path, 64 * megabyte, {8 * megabyte, 20 * megabyte + 4096, 20 * megabyte + 12'288});
-         },
-         checkSparse},
-        {"a hole only", [](const auto& path) { return makeSparse(path, 64 * megabyte + 1, {}); }, checkSparse},
-        {"a hole and a last byte", [](const auto& path) { return makeSparse(path, 3 * megabyte + 4, {3 * megabyte}); },
-         checkSparse},
-        {"larger than every buffer",
-         [](const auto& path) {
-             std::string content;
-             for (int i = 0; i < 300'000; ++i)
-                 content += std::to_string(i);
-             makeFile(AT_FDCWD, path, content);
-             return true;
-         }},
+         sparse(64 * megabyte, {8 * megabyte, 20 * megabyte + 4096, 20 * megabyte + 12'288}), checkSparse},
+        {"a hole only", sparse(64 * megabyte + 1, {}), checkSparse},
+        {"a hole and a last byte", sparse(3 * megabyte + 4, {3 * megabyte}), checkSparse},
+        {"larger than every buffer", makeLarge},
         {"names without order or form",
-         [](const auto& path) {
-             makeDirectory(AT_FDCWD, path);
-             makeFile(AT_FDCWD, path + "/\xff\xfe\n\t'\"");
-             makeFile(AT_FDCWD, path + "/" + std::string(255, 'n'));
-             makeFile(AT_FDCWD, path + "/.links-0000000000000000");
-             makeFile(AT_FDCWD, path + "/...");
-             return true;
-         }},
-        {"hard links in several directories",
-         [](const auto& path) {
-             makeDirectory(AT_FDCWD, path);
-             makeDirectory(AT_FDCWD, path + "/sub");
-             makeFile(AT_FDCWD, path + "/one", "linked");
-             return ::link((path + "/one").c_str(), (path + "/two").c_str()) == 0 &&
-                    ::link((path + "/one").c_str(), (path + "/sub/three").c_str()) == 0 &&
-                    ::link((path + "/one").c_str(), (path + "-outside").c_str()) == 0;
-         },
+         directoryOf({"\xff\xfe\n\t'\"", std::string(255, 'n'), ".links-0000000000000000", "..."})},
+        {"hard links in several directories", makeHardLinks,
          [](const auto& from, const auto& to) {
-             EXPECT_EQ(statusOf(to + "/one").st_ino, statusOf(to + "/two").st_ino);
-             EXPECT_EQ(statusOf(to + "/one").st_ino, statusOf(to + "/sub/three").st_ino);
              EXPECT_EQ(statusOf(to + "/one").st_nlink, 3U);
              EXPECT_EQ(statusOf(from + "/one").st_nlink, 4U);
          }},
         {"socket in a tree",
          [](const auto& path) {
-             makeDirectory(AT_FDCWD, path);
-             makeFile(AT_FDCWD, path + "/file");
-             return ::mknod((path + "/socket").c_str(), S_IFSOCK | 0600, 0) == 0;
+             return directoryOf({"file"})(path) && ::mknod((path + "/socket").c_str(), S_IFSOCK | 0600, 0) == 0;
          },
          [](const auto&, const auto& to) {
              EXPECT_TRUE(exists(AT_FDCWD, to + "/file"));
@@ -250,22 +196,23 @@ INSTANTIATE_TEST_SUITE_P(FileSystems, CopyFidelity,
 TEST_P(CopyFidelity, KeepsWhatIsMeantToBeKept) {
     const TemporaryDirectory source(GetParam().first);
     const TemporaryDirectory destination(GetParam().second);
-    const FileDescriptor from = openDirectory(AT_FDCWD, source.path());
-    const FileDescriptor to = openDirectory(AT_FDCWD, destination.path());
+    const FileDescriptor from = openDirectory(source.path());
+    const FileDescriptor to = openDirectory(destination.path());
     // A list that every new item would take over, were it not taken away again.
-    const bool inherits = setAttribute(destination.path(), defaultAcl, aclFor1234());
+    setAttribute(destination.path(), defaultAcl, aclFor1234());
     platform::LinuxDisk disk;
     const support::ProcessResources before;
     for (const FidelityCase& row : fidelityCases()) {
         SCOPED_TRACE(row.name);
+        const std::string name = std::string(".") + row.name;
         const std::string original = source.path() + "/" + row.name;
-        const std::string copy = destination.path() + "/." + row.name;
+        const std::string copy = destination.path() + "/" + name;
         if (!row.make(original)) {
             std::printf("skipped: %s\n", row.name);
             continue;
         }
         setOldTimes(original);
-        ASSERT_EQ(copyTree(disk, from.get(), row.name, to.get(), copy.substr(copy.rfind('/') + 1).c_str()), 0);
+        ASSERT_EQ(copyTree(disk, from.get(), row.name, to.get(), name.c_str()), 0);
         const struct stat a = statusOf(original);
         const struct stat b = statusOf(copy);
         EXPECT_EQ(a.st_mode & ~row.modeBitsDropped, b.st_mode);
@@ -273,20 +220,20 @@ TEST_P(CopyFidelity, KeepsWhatIsMeantToBeKept) {
         EXPECT_EQ(a.st_gid, b.st_gid);
         EXPECT_TRUE(hasOldTimes(copy));
         // Lists of FIFOs are not looked after.
-        EXPECT_TRUE(!inherits || S_ISFIFO(a.st_mode) || attribute(original, accessAcl) == attribute(copy, accessAcl));
-        if (S_ISDIR(a.st_mode)) {
-            EXPECT_EQ(attribute(original, defaultAcl), attribute(copy, defaultAcl));
-            if (std::string(row.name).find("socket") == std::string::npos) {
-                EXPECT_EQ(support::readTree(original).describe(), support::readTree(copy).describe());
-            }
-        } else {
-            EXPECT_EQ(support::readInode(AT_FDCWD, original.c_str()).content,
-                      support::readInode(AT_FDCWD, copy.c_str()).content);
+        EXPECT_TRUE(S_ISFIFO(a.st_mode) || attribute(original, accessAcl) == attribute(copy, accessAcl));
+        EXPECT_EQ(attribute(original, defaultAcl), attribute(copy, defaultAcl));
+        if (!S_ISDIR(a.st_mode)) {
+            const support::Inode first = support::readInode(AT_FDCWD, original.c_str());
+            const support::Inode copied = support::readInode(AT_FDCWD, copy.c_str());
+            EXPECT_EQ(first.content, copied.content);
+            EXPECT_EQ(first.attributes, copied.attributes);
+        } else if (std::string(row.name) != "socket in a tree") {
+            EXPECT_EQ(support::readTree(original).describe(), support::readTree(copy).describe());
         }
         if (row.check)
             row.check(original, copy);
         // What exists is never replaced or added to.
-        EXPECT_EQ(copyTree(disk, from.get(), row.name, to.get(), copy.substr(copy.rfind('/') + 1).c_str()), -EEXIST);
+        EXPECT_EQ(copyTree(disk, from.get(), row.name, to.get(), name.c_str()), -EEXIST);
     }
     EXPECT_EQ(before.leakedSince(), "");
 }
@@ -311,6 +258,40 @@ struct Prepared {
     int result = 0;
 };
 
+Prepared prepareTree(support::FaultDisk& disk) {
+    Prepared prepared{.world = std::make_unique<World>(), .disk = &disk};
+    const int fd = prepared.world->fd();
+    for (const char* path : {"tree", "tree/a", "tree/a/b"})
+        makeDirectory(fd, path, 0750);
+    makeFile(fd, "tree/f", "content");
+    makeFile(fd, "tree/a/b/f", "more");
+    makeItems(fd, {"tree/a/l -> target", "tree/a/fifo|"});
+    setAttribute(prepared.world->path() + "/tree/f", "user.some", "value");
+    EXPECT_EQ(::linkat(fd, "tree/f", fd, "tree/a/g", 0), 0);
+    return prepared;
+}
+
+/// A hard link or an attribute may be missing where the file system says that it has none.
+std::string judgeCopy(const Prepared& prepared, const support::FaultOutcome& outcome) {
+    const int error = outcome.fault.error;
+    if (prepared.result != 0 && (!outcome.met || prepared.result != -error))
+        return "returned " + std::to_string(prepared.result);
+    if (prepared.result != 0)
+        return prepared.world->damage();
+    if (outcome.met && error == EIO)
+        return "took no notice";
+    const auto original = support::readTree(prepared.world->path() + "/tree");
+    const auto copy = support::readTree(prepared.world->path() + "/.copy");
+    if (!outcome.met && copy.describe() != original.describe())
+        return "the copy differs";
+    for (const char* item : {"f", "a/g", "a/b/f", "a/l"}) {
+        const auto id = copy.resolve(item);
+        if (id == 0 || copy.inodes.at(id).content != original.inodes.at(original.resolve(item)).content)
+            return std::string(item) + " differs";
+    }
+    return copy.inodes.size() > original.inodes.size() + 1 ? "something was left over" : prepared.world->damage();
+}
+
 // Every call failing in turn, with an error that some calls may answer for good reason and one that none may: the copy
 // fails, or it is whole all the same; no descriptor is kept.
 TEST(CopyTree, IsNeverPartialAndSuccessful) {
@@ -318,49 +299,12 @@ TEST(CopyTree, IsNeverPartialAndSuccessful) {
     platform::LinuxDisk disk{platform::Syncs::off};
     for (const int error : {EIO, EOPNOTSUPP, EPERM}) {
         const auto report = support::forEachFaultPoint(
-            disk, {.error = error},
-            [](support::FaultDisk& faulty) {
-                Prepared prepared{.world = std::make_unique<World>(), .disk = &faulty};
-                const int fd = prepared.world->fd();
-                for (const char* path : {"tree", "tree/a", "tree/a/b"})
-                    makeDirectory(fd, path, 0750);
-                makeFile(fd, "tree/f", "content");
-                makeFile(fd, "tree/a/b/f", "more");
-                makeLink(fd, "tree/a/l", "target");
-                makeFifo(fd, "tree/a/fifo");
-                setAttribute(prepared.world->path() + "/tree/f", "user.some", "value");
-                EXPECT_EQ(::linkat(fd, "tree/f", fd, "tree/a/g", 0), 0);
-                return prepared;
-            },
+            disk, {.error = error}, prepareTree,
             [](Prepared& prepared) {
                 const int fd = prepared.world->fd();
                 prepared.result = copyTree(*prepared.disk, fd, "tree", fd, ".copy");
             },
-            [&](Prepared& prepared, const support::FaultOutcome& outcome) -> std::string {
-                if (!outcome.met && prepared.result != 0)
-                    return "failed without a fault";
-                if (outcome.met && prepared.result != 0 && prepared.result != -error)
-                    return "returned " + std::to_string(prepared.result);
-                if (outcome.met && error == EIO && prepared.result == 0)
-                    return "took no notice";
-                const std::string& path = prepared.world->path();
-                // A hard link or an attribute may be missing where the file system says that it has none.
-                auto original = support::readTree(path + "/tree");
-                if (prepared.result == 0 && error == EIO &&
-                    support::readTree(path + "/.copy").describe() != original.describe())
-                    return "the copy differs";
-                if (prepared.result == 0) {
-                    const auto copy = support::readTree(path + "/.copy");
-                    for (const char* item : {"f", "a/g", "a/b/f", "a/l"}) {
-                        const auto id = copy.resolve(item);
-                        if (id == 0 || copy.inodes.at(id).content != original.inodes.at(original.resolve(item)).content)
-                            return std::string(item) + " differs";
-                    }
-                    if (copy.inodes.size() > original.inodes.size() + 1)
-                        return "something was left over";
-                }
-                return prepared.world->damage();
-            });
+            judgeCopy);
         EXPECT_EQ(report.complaint, "") << error;
         EXPECT_GT(report.examined, 30U);
     }
@@ -370,20 +314,16 @@ TEST(CopyTree, IsNeverPartialAndSuccessful) {
 // A file of another owner below a directory that others can read is never readable in the half-made copy.
 TEST(CopyTree, IsClosedToOthersUntilItIsWhole) {
     World world;
-    makeDirectory(world.fd(), "tree", 0755);
-    makeDirectory(world.fd(), "tree/sub", 0755);
-    for (const char* path : {"tree/1", "tree/2", "tree/sub/1", "tree/sub/2"})
-        makeFile(world.fd(), path, "x", 0644);
+    makeItems(world.fd(), {"tree/", "tree/sub/", "tree/1", "tree/2", "tree/sub/1", "tree/sub/2"});
     support::FaultDisk disk(world.disk);
     std::size_t looks = 0;
     disk.arm({.point = 100'000, .filter = [&](const support::DiskCallInfo&) {
-                  struct stat status{};
-                  if (::fstatat(world.fd(), ".copy", &status, 0) == 0 && exists(world.fd(), ".copy/sub/1")) {
-                      const bool isWhole = exists(world.fd(), ".copy/sub/2") && exists(world.fd(), ".copy/1") &&
-                                           exists(world.fd(), ".copy/2");
-                      EXPECT_TRUE(isWhole || (status.st_mode & 077) == 0);
-                      ++looks;
-                  }
+                  if (!exists(world.fd(), ".copy/sub/1"))
+                      return true;
+                  const bool isWhole = exists(world.fd(), ".copy/sub/2") && exists(world.fd(), ".copy/1") &&
+                                       exists(world.fd(), ".copy/2");
+                  EXPECT_TRUE(isWhole || (statusOf(world.fd(), ".copy").st_mode & 077) == 0);
+                  ++looks;
                   return true;
               }});
     EXPECT_EQ(copyTree(disk, world.fd(), "tree", world.fd(), ".copy"), 0);
@@ -399,8 +339,7 @@ TEST(CopyTree, FillsOnlyTheDirectoryItMade) {
     makeDirectory(world.fd(), "victim", 0700);
     makeFile(world.fd(), "victim/keep");
     std::size_t refused = 0;
-    const auto end = std::chrono::steady_clock::now() + raceTime();
-    while (std::chrono::steady_clock::now() < end && refused < 20) {
+    const auto copyAside = [&] {
         std::atomic<bool> stopped{false};
         std::thread swapper([&] {
             while (!stopped && ::renameat2(world.fd(), ".copy", world.fd(), "victim", RENAME_EXCHANGE) != 0) {
@@ -410,20 +349,21 @@ TEST(CopyTree, FillsOnlyTheDirectoryItMade) {
         stopped = true;
         swapper.join();
         if (exists(world.fd(), ".copy/keep")) {
-            ASSERT_EQ(::renameat2(world.fd(), ".copy", world.fd(), "victim", RENAME_EXCHANGE), 0);
+            EXPECT_EQ(::renameat2(world.fd(), ".copy", world.fd(), "victim", RENAME_EXCHANGE), 0);
         }
-        ASSERT_TRUE(exists(world.fd(), "victim/keep"));
-        ASSERT_FALSE(exists(world.fd(), "victim/f"));
-        ASSERT_EQ(statusOf(world.path() + "/victim").st_mode & 0777, 0700U);
-        ASSERT_EQ(removeTree(world.disk, world.fd(), ".copy"), 0);
-    }
+        EXPECT_TRUE(exists(world.fd(), "victim/keep"));
+        EXPECT_FALSE(exists(world.fd(), "victim/f"));
+        EXPECT_EQ(statusOf(world.fd(), "victim").st_mode & 0777, 0700U);
+        EXPECT_EQ(removeTree(world.disk, world.fd(), ".copy"), 0);
+    };
+    repeatForRace(copyAside, [&] { return refused == 20; });
 }
 
 // Deeper than descriptors and paths reach.
 TEST(CopyTree, CopiesAnyDepth) {
     const std::size_t depth = isLongRun() ? 100'000 : 10'000;
     const TemporaryDirectory directory;
-    const FileDescriptor root = openDirectory(AT_FDCWD, directory.path());
+    const FileDescriptor root = openDirectory(directory.path());
     makeChain(root.get(), depth);
     platform::LinuxDisk disk;
     ASSERT_EQ(copyTree(disk, root.get(), "d", root.get(), "copy"), 0);
@@ -447,22 +387,21 @@ TEST(CopyTree, TakesNothingFromOutside) {
         std::size_t copies = 0;
         {
             const Vandal vandal(world);
-            const auto end = std::chrono::steady_clock::now() + raceTime();
-            for (; std::chrono::steady_clock::now() < end; ++copies) {
+            repeatForRace([&] {
                 // A single file is copied so often that its change into a FIFO falls between the look and the opening.
+                const std::size_t turn = copies++ % 50;
                 std::string source = "tree/wide/f" + std::to_string(copies % World::wideCount);
-                if (copies % 50 < 4) {
-                    source = copies % 50 == 0 ? "tree" : "tree/wide";
-                }
+                if (turn < 4)
+                    source = turn == 0 ? "tree" : "tree/wide";
                 copyTree(world.disk, world.fd(), source.c_str(), world.fd(), ".copy");
                 if (!exists(world.fd(), ".copy"))
-                    continue;
-                if (copies % 50 < 4) {
+                    return;
+                if (turn < 4) {
                     for (const auto& [id, inode] : support::readTree(world.path() + "/.copy").inodes)
-                        ASSERT_NE(std::string(inode.content.begin(), inode.content.end()), World::secret);
+                        EXPECT_NE(std::string(inode.content.begin(), inode.content.end()), World::secret);
                 }
-                ASSERT_EQ(removeTree(world.disk, world.fd(), ".copy"), 0);
-            }
+                EXPECT_EQ(removeTree(world.disk, world.fd(), ".copy"), 0);
+            });
         }
         EXPECT_EQ(world.damage(), "");
         EXPECT_EQ(openDescriptorCount(), descriptorsBefore);

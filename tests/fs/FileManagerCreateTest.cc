@@ -52,8 +52,8 @@ TEST_F(FileManager, IntermediateLevels) {
     ASSERT_TRUE(manager().createDirectoryAtURL(url("a/b/c"), Intermediates::yes, {.mode = 0700}));
     EXPECT_TRUE(item("a/b").starts_with("040755"));
     EXPECT_TRUE(item("a/b/c").starts_with("040700"));
-    const auto refused = manager().createDirectoryAtURL(url("x/y"), Intermediates::no, {});
-    expectPosix(refused, ENOENT, "mkdir of " + path("x/y") + " failed: No such file or directory");
+    expectPosix(manager().createDirectoryAtURL(url("x/y"), Intermediates::no, {}), ENOENT,
+                "mkdir of " + path("x/y") + " failed: No such file or directory");
     EXPECT_EQ(item("x"), "missing");
 }
 
@@ -61,9 +61,7 @@ TEST_F(FileManager, IntermediateLevels) {
 // stand in the place or on the way.
 TEST_F(FileManager, RefusesWhatStandsInThePlace) {
     makeDirectory("outside", 0700);
-    makeLink("link", "outside");
-    makeLink("dangling", "nowhere");
-    makeFile("file");
+    makeItems({"link -> outside", "dangling -> nowhere", "file"});
     struct Row {
         const char* name;
         int number;
@@ -104,16 +102,14 @@ TEST_F(FileManager, AFailingDiskNeverLeavesAHalfMadeName) {
 }
 
 TEST_F(FileManager, GivesDirectoriesTheirClassAtCreation) {
-    ASSERT_TRUE(manager().createDirectoryAtURL(url("d"), Intermediates::no, {.protectionClass = 4}));
-    EXPECT_EQ(manager().dataProtectionClassOfItemAtURL(url("d")).value(), 4);
-    ASSERT_TRUE(manager().createDirectoryAtURL(url("d"), Intermediates::no, {.protectionClass = 0}));
-    EXPECT_EQ(manager().dataProtectionClassOfItemAtURL(url("d")).value(), 0);
-    ASSERT_TRUE(manager().createDirectoryAtURL(url("d"), Intermediates::no, {}));
-    EXPECT_EQ(manager().dataProtectionClassOfItemAtURL(url("d")).value(), 0);
+    const std::pair<DirectoryAttributes, int> rows[] = {
+        {{.protectionClass = 4}, 4}, {{.protectionClass = 0}, 0}, {{}, 0}};
+    for (const auto& [attributes, expected] : rows) {
+        ASSERT_TRUE(manager().createDirectoryAtURL(url("d"), Intermediates::no, attributes));
+        EXPECT_EQ(manager().dataProtectionClassOfItemAtURL(url("d")).value(), expected);
+    }
     // A file system without classes is said once, and a directory is made all the same.
-    disk.arm({.error = EOPNOTSUPP, .span = support::FaultSpan::fromThenOn, .filter = [](const auto& info) {
-                  return info.call == DiskCall::setAttribute;
-              }});
+    fail(support::FaultSpan::fromThenOn, DiskCall::setAttribute, EOPNOTSUPP);
     for (const char* name : {"e", "f"})
         EXPECT_TRUE(manager().createDirectoryAtURL(url(name), Intermediates::no, {.protectionClass = 4}));
     EXPECT_EQ(lines.take(), (std::vector<LogLine>{{5, "setClassAtCreation",
@@ -133,20 +129,14 @@ TEST_F(FileManager, TemporaryDirectories) {
     if (isRoot()) {
         EXPECT_EQ(item("row/" + std::string(other->lastPathComponent())), "040700 501:501");
     }
-    const auto missing = manager().createTemporaryDirectoryInDirectoryURL(url("nowhere"));
-    ASSERT_FALSE(missing);
-    EXPECT_TRUE(missing.error().isPosix(ENOENT));
-    EXPECT_EQ(missing.error().description(),
-              "Failed to create temp dir at path " + path("nowhere/temp.XXXXXX") + " : No such file or directory");
+    expectPosix(manager().createTemporaryDirectoryInDirectoryURL(url("nowhere")), ENOENT,
+                "Failed to create temp dir at path " + path("nowhere/temp.XXXXXX") + " : No such file or directory");
 }
 
 // Goal: an item that cannot be examined neither exists nor does not exist. Method: each kind of item against both
 // questions, with the line that is written.
 TEST_F(FileManager, Existence) {
-    makeDirectory("d");
-    makeFile("f");
-    makeLink("dangling", "nowhere");
-    makeLink("toDirectory", "d");
+    makeItems({"d/", "f", "dangling -> nowhere", "toDirectory -> d"});
     struct Row {
         const char* name;
         bool exists;
@@ -171,9 +161,7 @@ TEST_F(FileManager, Existence) {
 // Goal: the class changes exactly when the predicate says so and the device allows it, and never through a link.
 // Method: a table over predicate, lock state and item.
 TEST_F(FileManager, SetsProtectionClasses) {
-    makeFile("f");
-    makeLink("link", "f");
-    ASSERT_EQ(::mkfifo(path("fifo").c_str(), 0644), 0);
+    makeItems({"f", "link -> f", "fifo|"});
     std::vector<int> asked;
     const auto says = [&](bool answer) {
         return [&asked, answer](int current) {
@@ -253,9 +241,7 @@ TEST_F(FileManager, HostileDictionaryFiles) {
     makeFile("othersWritable", bytes, 0646);
     makeFile("linked", bytes);
     ASSERT_EQ(::link(path("linked").c_str(), path("linkedToo").c_str()), 0);
-    makeLink("symbolic", "good");
-    ASSERT_EQ(::mkfifo(path("fifo").c_str(), 0644), 0);
-    makeDirectory("directory");
+    makeItems({"symbolic -> good", "fifo|", "directory/"});
     makeFile("large", bytes + std::string(bytesMax, ' '));
     makeFile("empty", "");
     makeFile("text", "hello");

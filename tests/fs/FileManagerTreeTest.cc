@@ -2,13 +2,12 @@
 // The file manager's work on trees: listing, moving (across file systems too), removing, re-owning, reporting orphans.
 #include "fs/FileManagerWorld.h"
 #include "fs/MetadataFileName.h"
+#include "fs/TreeWorld.h"
 
 #include <algorithm>
 #include <linux/fs.h>
-#include <sched.h>
 #include <sys/ioctl.h>
 #include <sys/mount.h>
-#include <sys/wait.h>
 
 namespace zor::fs::test {
 namespace {
@@ -17,13 +16,7 @@ using support::DiskCall;
 using support::LogLine;
 
 TEST_F(FileManager, ListsWhatIsNotHidden) {
-    makeDirectory("d");
-    makeDirectory("d/sub");
-    makeFile("d/file");
-    makeLink("d/link", "sub");
-    makeLink("d/dangling", "nowhere");
-    ASSERT_EQ(::mkfifo(path("d/fifo").c_str(), 0644), 0);
-    makeFile("d/.hidden");
+    makeItems({"d/", "d/sub/", "d/file", "d/link -> sub", "d/dangling -> nowhere", "d/fifo|", "d/.hidden"});
     makeFile(std::string("d/") + zor::names::metadataFile);
     makeFile("d/..odd");
     auto listed = manager().urlsForItemsInDirectoryAtURL(url("d"));
@@ -34,11 +27,8 @@ TEST_F(FileManager, ListsWhatIsNotHidden) {
     std::ranges::sort(shown);
     EXPECT_EQ(shown, (std::vector<std::string>{"dangling", "fifo", "file", "link", "sub/"}));
 
-    const auto missing = manager().urlsForItemsInDirectoryAtURL(url("nowhere"));
-    ASSERT_FALSE(missing);
-    EXPECT_TRUE(missing.error().isPosix(ENOENT));
-    EXPECT_EQ(missing.error().description(),
-              "_IterateDirectory for " + path("nowhere") + " returned No such file or directory");
+    expectPosix(manager().urlsForItemsInDirectoryAtURL(url("nowhere")), ENOENT,
+                "_IterateDirectory for " + path("nowhere") + " returned No such file or directory");
     EXPECT_TRUE(lines.take().empty());
     const auto noDirectory = manager().urlsForItemsInDirectoryAtURL(url("d/link"));
     ASSERT_FALSE(noDirectory);
@@ -53,9 +43,7 @@ TEST_F(FileManager, ListsWhatIsNotHidden) {
 
 // Goal: what a missing source, an occupied destination and a missing parent do, in all four forms. Method: a table.
 TEST_F(FileManager, MovesAndCopies) {
-    makeDirectory("full");
-    makeFile("full/f");
-    makeDirectory("empty");
+    makeItems({"full/", "full/f", "empty/"});
     const std::string none = " failed: No such file or directory";
     expectPosix(manager().moveItemAtURL(url("no"), url("to")), ENOENT,
                 "rename of " + path("no") + " to " + path("to") + none);
@@ -83,9 +71,7 @@ TEST_F(FileManager, MovesAndCopies) {
 }
 
 TEST_F(FileManager, AFailedCopyLeavesNothingUnderTheFinalName) {
-    makeDirectory("from");
-    makeFile("from/a");
-    makeFile("from/b");
+    makeItems({"from/", "from/a", "from/b"});
     for (std::size_t point = 1;; ++point) {
         disk.arm({.point = point});
         const auto copied = manager().copyItemAtURL(url("from"), url("to"));
@@ -116,51 +102,33 @@ TEST_F(FileManager, MovesAcrossFileSystems) {
     makeFile("from/small", "content", 0640);
     makeFile("from/large", std::string(256 * 1024, 'l'));
     ASSERT_EQ(::chown(path("from/small").c_str(), 501, 502), 0);
-    const pid_t child = ::fork();
-    ASSERT_GE(child, 0);
-    if (child == 0) {
-        constexpr int cannotMount = 77;
-        if (::unshare(CLONE_NEWNS) != 0 || ::mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
-            ::mount("tmpfs", path("other").c_str(), "tmpfs", 0, "size=128k") != 0)
-            ::_exit(cannotMount);
+    const bool permitted = inMountNamespace([this] {
+        ASSERT_EQ(::mount("tmpfs", path("other").c_str(), "tmpfs", 0, "size=128k"), 0);
         open();
-        int failed = 0;
-        const auto check = [&](bool holds, const char* what) {
-            if (!holds) {
-                std::fprintf(stderr, "does not hold: %s\n", what);
-                failed = 1;
-            }
-        };
         const auto tooLarge = manager().moveItemAtURL(url("from"), url("other/to"));
-        check(!tooLarge && tooLarge.error().isPosix(ENOSPC), "a full file system fails the move");
-        check(!tooLarge && tooLarge.error().description()->starts_with("clonetree of " + path("from") + " to "),
-              "with the copy's error");
-        check(names("other").empty(), "nothing stays of the copy");
-        check(names("from") == std::vector<std::string>{"large", "small"}, "the source stays");
-        check(::unlink(path("from/large").c_str()) == 0, "unlink");
-        check(manager().moveItemAtURL(url("from"), url("other/to")).has_value(), "the move succeeds");
-        check(item("from") == "missing", "the source is gone");
-        check(content("other/to/small") == "content", "the content is there");
-        check(item("other/to/small") == "100640 501:502", "with mode and owner");
-        check(item("other/to").starts_with("040711"), "and those of the directory");
-        check(names("other") == std::vector<std::string>{"to"}, "under its one name");
+        ASSERT_FALSE(tooLarge);
+        EXPECT_TRUE(tooLarge.error().isPosix(ENOSPC));
+        EXPECT_TRUE(tooLarge.error().description()->starts_with("clonetree of " + path("from") + " to "));
+        EXPECT_EQ(names("other"), std::vector<std::string>());
+        EXPECT_EQ(names("from"), (std::vector<std::string>{"large", "small"}));
+        ASSERT_EQ(::unlink(path("from/large").c_str()), 0);
+        EXPECT_TRUE(manager().moveItemAtURL(url("from"), url("other/to")));
+        EXPECT_EQ(item("from"), "missing");
+        EXPECT_EQ(content("other/to/small"), "content");
+        EXPECT_EQ(item("other/to/small"), "100640 501:502");
+        EXPECT_TRUE(item("other/to").starts_with("040711"));
+        EXPECT_EQ(names("other"), std::vector<std::string>{"to"});
         // A source that cannot be removed is said and is no failure.
         failNext(DiskCall::unlinkFile, EIO);
         lines.take();
-        check(manager().moveItemAtURL(url("other/to/small"), url("back")).has_value(), "back again");
-        check(
-            lines.take(3, "moveAcrossFileSystems") ==
-                std::vector<std::string>{"Failed to remove source " + path("other/to/small") + " : Input/output error"},
-            "a source that stays is said");
-        check(content("back") == "content", "the moved file is whole");
-        ::_exit(failed);
-    }
-    int status = 0;
-    ASSERT_EQ(::waitpid(child, &status, 0), child);
-    ASSERT_TRUE(WIFEXITED(status));
-    if (WEXITSTATUS(status) == 77)
+        EXPECT_TRUE(manager().moveItemAtURL(url("other/to/small"), url("back")));
+        EXPECT_EQ(
+            lines.take(3, "moveAcrossFileSystems"),
+            std::vector<std::string>{"Failed to remove source " + path("other/to/small") + " : Input/output error"});
+        EXPECT_EQ(content("back"), "content");
+    });
+    if (!permitted)
         GTEST_SKIP() << "skipped: no mount namespace to be had";
-    EXPECT_EQ(WEXITSTATUS(status), 0);
 }
 
 bool setImmutable(const std::string& path, bool immutable) {
@@ -179,16 +147,10 @@ TEST_F(FileManager, RemovesTrees) {
     EXPECT_TRUE(manager().removeItemAtURL(url("missing/below")));
     expectPosix(manager().removeItemAtURL(std::nullopt), EFAULT, "nil url passed to -removeItemAtURL:error:");
     EXPECT_TRUE(lines.take().empty());
-    makeDirectory("outside");
-    makeFile("outside/kept");
-    makeDirectory("tree");
+    makeItems({"outside/", "outside/kept", "tree/"});
     makeDirectory("tree/closed", 0);
-    makeLink("tree/link", "../outside");
-    makeFile("tree/a");
-    makeFile("tree/b");
-    disk.arm({.error = EACCES, .span = support::FaultSpan::fromThenOn, .filter = [](const auto& info) {
-                  return info.call == DiskCall::unlinkFile && info.subject == "a";
-              }});
+    makeItems({"tree/link -> ../outside", "tree/a", "tree/b"});
+    fail(support::FaultSpan::fromThenOn, DiskCall::unlinkFile, EACCES, "a");
     const auto failed = manager().removeItemAtURL(url("tree"));
     disk.disarm();
     expectPosix(failed, EACCES, "prunetree of " + path("tree") + " failed: Permission denied");
@@ -203,17 +165,14 @@ TEST_F(FileManager, RemovesTrees) {
 }
 
 TEST_F(FileManager, RemovesImmutableFiles) {
-    makeDirectory("tree");
-    makeFile("tree/file");
-    makeFile("tree/other");
+    makeItems({"tree/", "tree/file", "tree/other"});
     if (!setImmutable(path("tree/file"), true))
         GTEST_SKIP() << "skipped: no immutable files here";
     for (const auto& [call, line] :
          {std::pair(DiskCall::setInodeFlags, "Failed to lchflags "), std::pair(DiskCall::unlinkFile, "unlink of ")}) {
-        int calls = call == DiskCall::setInodeFlags ? 1 : 0; // the second unlink: of what is mutable now
-        disk.arm({.error = EIO, .filter = [&](const auto& info) {
-                      return info.call == call && (call != DiskCall::unlinkFile || info.subject == "file") &&
-                             ++calls == 2;
+        const bool unlinks = call == DiskCall::unlinkFile; // the second time, of what is mutable now
+        disk.arm({.point = unlinks ? 2U : 1U, .filter = [&](const auto& info) {
+                      return info.call == call && (!unlinks || info.subject == "file");
                   }});
         EXPECT_FALSE(manager().removeItemAtURL(url("tree")));
         disk.disarm();
@@ -267,9 +226,7 @@ TEST_F(FileManager, StandardisesOwnership) {
     EXPECT_EQ(item("outside"), "100600 0:0");
     EXPECT_EQ(item("shared"), "100600 0:0");
     EXPECT_TRUE(lines.take().empty());
-    disk.arm({.error = EROFS, .span = support::FaultSpan::fromThenOn, .filter = [](const auto& info) {
-                  return info.call == DiskCall::changeOwner;
-              }});
+    fail(support::FaultSpan::fromThenOn, DiskCall::changeOwner, EROFS);
     EXPECT_TRUE(manager().standardizeOwnershipAtURL(url("tree/plain"), 33, 33));
     disk.disarm();
     EXPECT_TRUE(hasLine(lines.take(), 3, "standardizeOwnershipAtURL",

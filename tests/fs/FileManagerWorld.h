@@ -8,12 +8,13 @@
 #include "platform/linux/XattrProtectionClass.h"
 #include "support/FaultDisk.h"
 #include "support/FileTree.h"
+#include "support/Files.h"
 #include "support/RecordingLog.h"
 
 #include <algorithm>
 #include <cstdio>
-#include <dirent.h>
 #include <fcntl.h>
+#include <filesystem>
 #include <fstream>
 #include <gtest/gtest.h>
 #include <iterator>
@@ -52,15 +53,16 @@ protected:
     [[nodiscard]] FileURL url(const std::string& name) const { return FileURL::directory(path(name)); }
 
     void makeDirectory(const std::string& name, mode_t mode = 0755) const {
-        ASSERT_EQ(::mkdir(path(name).c_str(), 0700), 0) << name;
-        ASSERT_EQ(::chmod(path(name).c_str(), mode), 0);
+        support::makeDirectory(AT_FDCWD, path(name), mode);
     }
     void makeFile(const std::string& name, const std::string& content = "x", mode_t mode = 0644) const {
-        std::ofstream(path(name)) << content;
-        ASSERT_EQ(::chmod(path(name).c_str(), mode), 0) << name;
+        support::makeFile(AT_FDCWD, path(name), content, mode);
     }
     void makeLink(const std::string& name, const std::string& target) const {
-        ASSERT_EQ(::symlink(target.c_str(), path(name).c_str()), 0) << name;
+        support::makeLink(AT_FDCWD, path(name), target);
+    }
+    void makeItems(const std::vector<std::string>& items) const {
+        support::makeItems(support::openDirectory(directory_.path()).get(), items);
     }
     [[nodiscard]] std::string content(const std::string& name) const {
         std::ifstream file(path(name));
@@ -77,20 +79,20 @@ protected:
     }
     [[nodiscard]] std::vector<std::string> names(const std::string& name) const {
         std::vector<std::string> found;
-        DIR* directory = ::opendir(path(name).c_str());
-        while (const dirent* entry = directory ? ::readdir(directory) : nullptr)
-            if (entry->d_name != std::string(".") && entry->d_name != std::string(".."))
-                found.emplace_back(entry->d_name);
-        if (directory)
-            ::closedir(directory);
+        for (const auto& entry : std::filesystem::directory_iterator(path(name)))
+            found.push_back(entry.path().filename().string());
         std::ranges::sort(found);
         return found;
     }
-    /// The next call of this kind fails once.
-    void failNext(support::DiskCall call, int error) {
-        disk.arm({.error = error, .filter = [call](const support::DiskCallInfo& info) { return info.call == call; }});
+    /// The next call of this kind, or each until the disk is disarmed, fails; only one for `name`, when that is given.
+    void fail(support::FaultSpan span, support::DiskCall call, int error, const std::string& name = "") {
+        disk.arm({.error = error, .span = span, .filter = [=](const support::DiskCallInfo& info) {
+                      return info.call == call && (name.empty() || info.subject == name);
+                  }});
     }
-    static void expectPosix(const Result<void>& result, int number, const std::string& description) {
+    void failNext(support::DiskCall call, int error) { fail(support::FaultSpan::once, call, error); }
+    template <typename Value>
+    static void expectPosix(const Result<Value>& result, int number, const std::string& description) {
         ASSERT_FALSE(result);
         EXPECT_TRUE(result.error().isPosix(number)) << result.error().text();
         EXPECT_EQ(result.error().description(), description);

@@ -18,25 +18,22 @@
 namespace zor::fs::test {
 namespace {
 
-using platform::FileDescriptor;
-using support::TemporaryDirectory;
-
 constexpr int protectingFlags = FS_IMMUTABLE_FL | FS_APPEND_FL;
+
+/// Which of the protecting flags it has; -1 where there are none to be had.
+int flagsOf(int parent, const std::string& path) {
+    const FileDescriptor fd(::openat(parent, path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+    int flags = 0;
+    return ::ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) == 0 ? flags & protectingFlags : -1;
+}
 
 /// Sets exactly these of the protecting flags; the file system has others of its own.
 bool setFlags(int parent, const std::string& path, int wanted) {
     const FileDescriptor fd(::openat(parent, path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
     int flags = 0;
-    if (::ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) != 0)
-        return false;
+    const bool known = ::ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) == 0;
     flags = (flags & ~protectingFlags) | wanted;
-    return ::ioctl(fd.get(), FS_IOC_SETFLAGS, &flags) == 0;
-}
-
-int flagsOf(int parent, const std::string& path) {
-    const FileDescriptor fd(::openat(parent, path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
-    int flags = 0;
-    return ::ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) == 0 ? flags & protectingFlags : -1;
+    return known && ::ioctl(fd.get(), FS_IOC_SETFLAGS, &flags) == 0;
 }
 
 /// The paths of failed items, and of directories made mutable with a "+".
@@ -59,8 +56,7 @@ TEST(RemoveTree, RemovesWhateverItIsGiven) {
     const support::ProcessResources before;
     makeFile(world.fd(), "file");
     makeLink(world.fd(), "link", world.path() + "/outside");
-    makeFifo(world.fd(), "fifo");
-    makeDirectory(world.fd(), "empty");
+    makeItems(world.fd(), {"fifo|", "empty/"});
     for (const char* name : {"tree", "file", "link", "fifo", "empty"}) {
         EXPECT_EQ(removeTree(world.disk, world.fd(), name), 0) << name;
         EXPECT_FALSE(exists(world.fd(), name)) << name;
@@ -99,10 +95,9 @@ TEST(RemoveTree, ClearsFlagsOfDirectoriesInsideTheTree) {
     for (const FlagCase& row : cases) {
         for (const bool withCallbacks : {false, true}) {
             const TemporaryDirectory directory("/tmp");
-            const FileDescriptor root = openDirectory(AT_FDCWD, directory.path());
-            for (const char* path : {"top", "top/tree", "top/tree/a", "top/tree/a/b", "top/tree/a/empty"})
-                makeDirectory(root.get(), path);
-            makeFile(root.get(), "top/tree/a/b/file");
+            const FileDescriptor root = openDirectory(directory.path());
+            makeItems(root.get(),
+                      {"top/", "top/tree/", "top/tree/a/", "top/tree/a/b/", "top/tree/a/empty/", "top/tree/a/b/file"});
             if (!setFlags(root.get(), row.path, row.flags))
                 GTEST_SKIP() << "no inode flags in /tmp";
             const FileDescriptor top = openDirectory(root.get(), "top");
@@ -128,15 +123,12 @@ TEST(RemoveTree, LetsACallbackRepairImmutableFiles) {
     if (::geteuid() != 0)
         GTEST_SKIP() << "only root may set inode flags";
     const TemporaryDirectory directory("/tmp");
-    const FileDescriptor root = openDirectory(AT_FDCWD, directory.path());
-    makeDirectory(root.get(), "tree");
-    makeFile(root.get(), "tree/file");
-    makeFile(root.get(), "outside");
+    const FileDescriptor root = openDirectory(directory.path());
+    makeItems(root.get(), {"tree/", "tree/file", "outside"});
     if (!setFlags(root.get(), "tree/file", FS_IMMUTABLE_FL | FS_APPEND_FL) ||
         !setFlags(root.get(), "outside", FS_IMMUTABLE_FL))
         GTEST_SKIP() << "no inode flags in /tmp";
-    makeLink(root.get(), "link", "outside");
-    makeFifo(root.get(), "fifo");
+    makeItems(root.get(), {"link -> outside", "fifo|"});
     platform::LinuxDisk disk;
     EXPECT_EQ(clearImmutable(disk, root.get(), "link"), 0);
     EXPECT_EQ(clearImmutable(disk, root.get(), "fifo"), 0);
@@ -163,8 +155,7 @@ TEST(RemoveTree, LetsACallbackRepairImmutableFiles) {
 // Names that come into a directory while it is removed are removed as well; a root that turns into something else, too.
 TEST(RemoveTree, RemovesWhatIsAddedMeanwhile) {
     World world;
-    makeDirectory(world.fd(), "tree");
-    makeFile(world.fd(), "tree/file");
+    makeItems(world.fd(), {"tree/", "tree/file"});
     int additions = 0;
     support::FaultDisk disk(world.disk);
     // The filter sees each call before it is made.
@@ -209,10 +200,8 @@ TEST(RemoveTree, SaysEveryFailure) {
                 int result = 0;
             };
             Prepared prepared{.world = std::make_unique<World>(), .disk = &disk};
-            for (const char* path : {"tree", "tree/a", "tree/a/b", "tree/c"})
-                makeDirectory(prepared.world->fd(), path);
-            for (const char* path : {"tree/f", "tree/a/f", "tree/a/b/f", "tree/a/b/g", "tree/c/f"})
-                makeFile(prepared.world->fd(), path);
+            makeItems(prepared.world->fd(), {"tree/", "tree/a/", "tree/a/b/", "tree/c/", "tree/f", "tree/a/f",
+                                             "tree/a/b/f", "tree/a/b/g", "tree/c/f"});
             return prepared;
         },
         [](auto& prepared) { prepared.result = removeTree(*prepared.disk, prepared.world->fd(), "tree"); },
@@ -234,9 +223,7 @@ TEST(RemoveTree, SaysEveryFailure) {
 TEST(RemoveTree, TellsWhatStaysOnce) {
     World world;
     for (const RemoveAnswer answer : {RemoveAnswer::proceed, RemoveAnswer::stop}) {
-        for (const char* path : {"tree", "tree/a", "tree/a/b"})
-            makeDirectory(world.fd(), path);
-        makeFile(world.fd(), "tree/a/b/f");
+        makeItems(world.fd(), {"tree/", "tree/a/", "tree/a/b/", "tree/a/b/f"});
         support::FaultDisk disk(world.disk);
         disk.arm(
             {.error = EACCES, .span = support::FaultSpan::fromThenOn, .filter = [](const support::DiskCallInfo& info) {
@@ -256,9 +243,7 @@ TEST(RemoveTree, StaysInATreeThatIsMovedAbout) {
     World world;
     const bool permitted = world.confined([&] {
         const std::size_t descriptorsBefore = openDescriptorCount();
-        std::size_t removals = 0;
-        const auto end = std::chrono::steady_clock::now() + raceTime();
-        for (; std::chrono::steady_clock::now() < end; ++removals) {
+        const std::size_t removals = repeatForRace([&] {
             world.makeTree();
             {
                 const Vandal vandal(world);
@@ -266,9 +251,9 @@ TEST(RemoveTree, StaysInATreeThatIsMovedAbout) {
             }
             removeTree(world.disk, world.fd(), "tree");
             removeTree(world.disk, world.fd(), "outside/parking/moved");
-            ASSERT_FALSE(exists(world.fd(), "tree")) << removals;
-            ASSERT_EQ(world.damage(), "") << removals;
-        }
+            EXPECT_FALSE(exists(world.fd(), "tree"));
+            EXPECT_EQ(world.damage(), "");
+        });
         EXPECT_GT(removals, 3U);
         EXPECT_EQ(openDescriptorCount(), descriptorsBefore);
     });

@@ -20,27 +20,15 @@
 namespace zor::fs::test {
 namespace {
 
-using platform::FileDescriptor;
-using support::TemporaryDirectory;
-
 const char* text(WalkEntryKind kind) {
-    switch (kind) {
-    case WalkEntryKind::directory:
-        return "directory";
-    case WalkEntryKind::directoryEnd:
-        return "end";
-    case WalkEntryKind::unreadableDirectory:
-        return "unreadable";
-    case WalkEntryKind::file:
-        return "file";
-    case WalkEntryKind::symbolicLink:
-        return "link";
-    case WalkEntryKind::other:
-        return "other";
-    case WalkEntryKind::noStatus:
-        return "no status";
-    }
-    return "";
+    static const std::map<WalkEntryKind, const char*> texts = {{WalkEntryKind::directory, "directory"},
+                                                               {WalkEntryKind::directoryEnd, "end"},
+                                                               {WalkEntryKind::unreadableDirectory, "unreadable"},
+                                                               {WalkEntryKind::file, "file"},
+                                                               {WalkEntryKind::symbolicLink, "link"},
+                                                               {WalkEntryKind::other, "other"},
+                                                               {WalkEntryKind::noStatus, "no status"}};
+    return texts.at(kind);
 }
 
 /// "kind path" of every visit, sorted, since a directory has no order of its own.
@@ -54,44 +42,12 @@ std::vector<std::string> visits(TreeWalker& walker, int parent, const char* name
     return seen;
 }
 
-/// Runs `body` with mounts of its own in a child. Empty, or its complaint; nothing when mounting is not permitted.
-std::optional<std::string> inMountNamespace(const std::function<std::string()>& body) {
-    int ends[2];
-    if (::pipe2(ends, O_CLOEXEC) != 0)
-        return "pipe";
-    FileDescriptor reading(ends[0]);
-    FileDescriptor writing(ends[1]);
-    const pid_t child = ::fork();
-    if (child == 0) {
-        if (::unshare(CLONE_NEWNS) != 0 || ::mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0)
-            ::_exit(2);
-        const std::string complaint = body();
-        [[maybe_unused]] const ssize_t written = ::write(writing.get(), complaint.data(), complaint.size());
-        ::_exit(0);
-    }
-    writing.reset();
-    std::string complaint;
-    char buffer[4096];
-    for (ssize_t count; (count = ::read(reading.get(), buffer, sizeof buffer)) > 0;)
-        complaint.append(buffer, static_cast<std::size_t>(count));
-    int status = 0;
-    ::waitpid(child, &status, 0);
-    if (WIFEXITED(status) && WEXITSTATUS(status) == 2)
-        return std::nullopt;
-    return WIFEXITED(status) && WEXITSTATUS(status) == 0 ? complaint : "the child died";
-}
-
 // Every kind of item, each directory before and after what it holds; links are not followed, dangling or not.
 TEST(TreeWalker, VisitsEveryItemOfATree) {
     const TemporaryDirectory directory;
-    const FileDescriptor root = openDirectory(AT_FDCWD, directory.path());
-    makeDirectory(root.get(), "tree");
-    makeDirectory(root.get(), "tree/empty");
-    makeDirectory(root.get(), "tree/full");
-    makeFile(root.get(), "tree/full/.hidden");
-    makeLink(root.get(), "tree/full/dangling", "nowhere");
-    makeLink(root.get(), "tree/full/up", "..");
-    makeFifo(root.get(), "tree/fifo");
+    const FileDescriptor root = openDirectory(directory.path());
+    makeItems(root.get(), {"tree/", "tree/empty/", "tree/full/", "tree/full/.hidden", "tree/full/dangling -> nowhere",
+                           "tree/full/up -> ..", "tree/fifo|"});
     ASSERT_EQ(::mknodat(root.get(), "tree/socket", S_IFSOCK | 0600, 0), 0);
     const std::vector<std::string> expected = {
         "directory ",        "directory empty",    "directory full", "end ",       "end empty",   "end full",
@@ -121,16 +77,11 @@ TEST(TreeWalker, GivesWhatAVisitorNeeds) {
     TreeWalker walker;
     std::map<std::string, unsigned> ends;
     walker.walk(world.fd(), "tree", [&](const WalkEntry& entry) {
-        struct stat status{};
-        EXPECT_EQ(::fstatat(entry.parent, entry.name, &status, AT_SYMLINK_NOFOLLOW), 0);
-        EXPECT_EQ(status.st_ino, entry.status.st_ino) << entry.path();
-        EXPECT_EQ(status.st_mode, entry.status.st_mode) << entry.path();
-        struct stat byPath{};
-        EXPECT_EQ(::fstatat(world.fd(), ("tree/" + entry.path()).c_str(), &byPath, AT_SYMLINK_NOFOLLOW), 0);
-        EXPECT_EQ(byPath.st_ino, entry.status.st_ino) << entry.path();
+        EXPECT_EQ(statusOf(entry.parent, entry.name).st_ino, entry.status.st_ino) << entry.path();
+        EXPECT_EQ(statusOf(entry.parent, entry.name).st_mode, entry.status.st_mode) << entry.path();
+        EXPECT_EQ(statusOf(world.fd(), "tree/" + entry.path()).st_ino, entry.status.st_ino) << entry.path();
         if (entry.directory >= 0) {
-            EXPECT_EQ(::fstat(entry.directory, &status), 0);
-            EXPECT_EQ(status.st_ino, entry.status.st_ino) << entry.path();
+            EXPECT_EQ(statusOf(entry.directory, ".").st_ino, entry.status.st_ino) << entry.path();
         }
         if (entry.kind == WalkEntryKind::directory && entry.path() == chainPath(2))
             return WalkStep::skip;
@@ -170,11 +121,8 @@ TEST(TreeWalker, GoesUpOnlyIntoDirectoriesItCameFrom) {
         World world;
         world.makeTree();
         std::vector<ino_t> chain;
-        for (std::size_t depth = 0; depth <= World::chainDepth; ++depth) {
-            struct stat status{};
-            EXPECT_EQ(::fstatat(world.fd(), ("tree/" + chainPath(depth)).c_str(), &status, 0), 0);
-            chain.push_back(status.st_ino);
-        }
+        for (std::size_t depth = 0; depth <= World::chainDepth; ++depth)
+            chain.push_back(statusOf(world.fd(), "tree/" + chainPath(depth)).st_ino);
         std::set<std::size_t> ended;
         TreeWalker walker;
         const int result = walker.walk(world.fd(), "tree", [&](const WalkEntry& entry) {
@@ -249,12 +197,10 @@ TEST(TreeWalker, StaysInATreeThatIsMovedAbout) {
     const bool permitted = world.confined([&] {
         world.makeTree();
         const std::size_t descriptorsBefore = openDescriptorCount();
-        std::size_t walks = 0;
         std::size_t disturbed = 0;
         {
             const Vandal vandal(world);
-            const auto end = std::chrono::steady_clock::now() + raceTime();
-            for (; std::chrono::steady_clock::now() < end; ++walks) {
+            repeatForRace([&] {
                 TreeWalker walker;
                 std::size_t deepest = 0;
                 walker.walk(world.fd(), "tree", [&](const WalkEntry& entry) {
@@ -265,12 +211,12 @@ TEST(TreeWalker, StaysInATreeThatIsMovedAbout) {
                     return WalkStep::proceed;
                 });
                 disturbed += walker.vanishedDirectories() > 0 || deepest < World::chainDepth ? 1 : 0;
-            }
+            });
         }
         EXPECT_EQ(world.damage(), "");
         EXPECT_EQ(openDescriptorCount(), descriptorsBefore);
         // Else the owner did not get in between, and the test says nothing.
-        EXPECT_GT(disturbed, 0U) << walks << " walks";
+        EXPECT_GT(disturbed, 0U);
     });
     if (!permitted)
         GTEST_SKIP() << "chroot is not permitted";
@@ -278,9 +224,9 @@ TEST(TreeWalker, StaysInATreeThatIsMovedAbout) {
 
 // Directories beyond the number of descriptors and beyond any path: all visited, with few descriptors.
 TEST(TreeWalker, WalksAnyDepth) {
-    constexpr std::size_t depth = 100'000;
+    const std::size_t depth = isLongRun() ? 100'000 : 10'000;
     const TemporaryDirectory directory;
-    const FileDescriptor root = openDirectory(AT_FDCWD, directory.path());
+    const FileDescriptor root = openDirectory(directory.path());
     makeChain(root.get(), depth);
     std::size_t visited = 0;
     std::size_t descriptorsMost = 0;
@@ -303,30 +249,22 @@ TEST(TreeWalker, WalksAnyDepth) {
 // Mount points, of another file system and of this one (a loop), and a mount on a file: shown, not entered.
 TEST(TreeWalker, DoesNotCrossMounts) {
     World world;
-    makeDirectory(world.fd(), "tree");
-    makeDirectory(world.fd(), "tree/other");
-    makeDirectory(world.fd(), "tree/loop");
-    makeFile(world.fd(), "tree/file");
-    const auto complaint = inMountNamespace([&]() -> std::string {
+    makeItems(world.fd(), {"tree/", "tree/other/", "tree/loop/", "tree/file"});
+    const bool permitted = inMountNamespace([&] {
         const std::string tree = world.path() + "/tree";
-        if (::mount("none", (tree + "/other").c_str(), "tmpfs", 0, nullptr) != 0 ||
-            ::mount(tree.c_str(), (tree + "/loop").c_str(), nullptr, MS_BIND, nullptr) != 0 ||
-            ::mount("/proc/version", (tree + "/file").c_str(), nullptr, MS_BIND, nullptr) != 0)
-            return "mount failed";
+        ASSERT_EQ(::mount("none", (tree + "/other").c_str(), "tmpfs", 0, nullptr), 0);
+        ASSERT_EQ(::mount(tree.c_str(), (tree + "/loop").c_str(), nullptr, MS_BIND, nullptr), 0);
+        ASSERT_EQ(::mount("/proc/version", (tree + "/file").c_str(), nullptr, MS_BIND, nullptr), 0);
         makeFile(AT_FDCWD, tree + "/other/inside");
         // A descriptor from before belongs to the parent's mounts.
-        const FileDescriptor root = openDirectory(AT_FDCWD, world.path());
+        const FileDescriptor root = openDirectory(world.path());
         TreeWalker walker;
-        std::string seen;
-        for (const std::string& visit : visits(walker, root.get(), "tree"))
-            seen += visit + "; ";
-        const std::string expected = "directory ; directory loop (away); directory other (away); end ; "
-                                     "end loop (away); end other (away); file file (away); ";
-        return seen == expected ? "" : seen;
+        EXPECT_EQ(visits(walker, root.get(), "tree"),
+                  (std::vector<std::string>{"directory ", "directory loop (away)", "directory other (away)", "end ",
+                                            "end loop (away)", "end other (away)", "file file (away)"}));
     });
-    if (!complaint)
+    if (!permitted)
         GTEST_SKIP() << "mounting is not permitted";
-    EXPECT_EQ(*complaint, "");
 }
 
 /// Resident memory in bytes.
@@ -343,7 +281,7 @@ std::size_t residentBytes() {
 TEST(TreeWalker, WalksAnyWidth) {
     const std::size_t width = isLongRun() ? 1'000'000 : 100'000;
     const TemporaryDirectory directory;
-    const FileDescriptor root = openDirectory(AT_FDCWD, directory.path());
+    const FileDescriptor root = openDirectory(directory.path());
     makeDirectory(root.get(), "wide");
     const FileDescriptor wide = openDirectory(root.get(), "wide");
     for (std::size_t i = 0; i < width; ++i)

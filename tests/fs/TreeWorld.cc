@@ -1,33 +1,53 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/TreeWorld.h"
 
-#include <cerrno>
+#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <random>
-#include <sys/stat.h>
+#include <sched.h>
+#include <sys/mount.h>
 #include <sys/wait.h>
-#include <system_error>
 #include <unistd.h>
 
 namespace zor::fs::test {
 
-using platform::FileDescriptor;
+using support::checked;
 
 namespace {
-
-void check(int result, const std::string& what) {
-    if (result < 0)
-        throw std::system_error(errno, std::generic_category(), what);
-}
 
 std::string upwards(std::size_t levels) {
     std::string path;
     while (levels-- > 0)
         path += "../";
     return path;
+}
+
+/// `enter` says whether it could.
+bool inChild(const std::function<bool()>& enter, const std::function<void()>& body) {
+    constexpr int passed = 0;
+    constexpr int failed = 1;
+    constexpr int notPermitted = 2;
+    std::fflush(nullptr);
+    const pid_t child = checked(::fork(), "fork");
+    if (child == 0) {
+        if (!enter())
+            ::_exit(notPermitted);
+        try {
+            body();
+        } catch (const std::exception& error) {
+            ADD_FAILURE() << error.what();
+        }
+        std::fflush(nullptr);
+        ::_exit(testing::Test::HasFailure() ? failed : passed);
+    }
+    int status = 0;
+    checked(::waitpid(child, &status, 0), "waitpid");
+    EXPECT_TRUE(WIFEXITED(status)) << "ended by signal " << WTERMSIG(status);
+    EXPECT_NE(WEXITSTATUS(status), failed) << "see above";
+    return !WIFEXITED(status) || WEXITSTATUS(status) != notPermitted;
 }
 
 } // namespace
@@ -37,8 +57,14 @@ bool isLongRun() {
     return value != nullptr && std::string(value) == "1";
 }
 
-std::chrono::seconds raceTime() {
-    return std::chrono::seconds(isLongRun() ? 30 : 2);
+std::size_t repeatForRace(const std::function<void()>& body, const std::function<bool()>& isEnough) {
+    const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(isLongRun() ? 30 : 2);
+    std::size_t times = 0;
+    while (std::chrono::steady_clock::now() < end && !testing::Test::HasFailure() && !(isEnough && isEnough())) {
+        body();
+        ++times;
+    }
+    return times;
 }
 
 std::size_t openDescriptorCount() {
@@ -50,45 +76,30 @@ std::size_t openDescriptorCount() {
     return count;
 }
 
-FileDescriptor openDirectory(int parent, const std::string& path) {
-    FileDescriptor fd(::openat(parent, path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-    check(fd.get(), "open " + path);
-    return fd;
-}
-
-void makeDirectory(int parent, const std::string& path, mode_t mode) {
-    check(::mkdirat(parent, path.c_str(), 0755), "mkdir " + path);
-    check(::fchmodat(parent, path.c_str(), mode, 0), "chmod " + path);
-}
-
-void makeFile(int parent, const std::string& path, const std::string& content, mode_t mode) {
-    const FileDescriptor fd(::openat(parent, path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
-    check(fd.get(), "create " + path);
-    check(static_cast<int>(::write(fd.get(), content.data(), content.size())), "write " + path);
-    check(::fchmod(fd.get(), mode), "chmod " + path);
-}
-
-void makeLink(int parent, const std::string& path, const std::string& target) {
-    check(::symlinkat(target.c_str(), parent, path.c_str()), "symlink " + path);
-}
-
-void makeFifo(int parent, const std::string& path) {
-    check(::mkfifoat(parent, path.c_str(), 0644), "mkfifo " + path);
-}
-
-bool exists(int parent, const std::string& path) {
+struct stat statusOf(int parent, const std::string& path) {
     struct stat status{};
-    return ::fstatat(parent, path.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0;
+    checked(::fstatat(parent, path.c_str(), &status, AT_SYMLINK_NOFOLLOW), "stat " + path);
+    return status;
+}
+
+struct stat statusOf(const std::string& path) {
+    return statusOf(AT_FDCWD, path);
+}
+
+bool inMountNamespace(const std::function<void()>& body) {
+    const auto enter = [] {
+        return ::unshare(CLONE_NEWNS) == 0 && ::mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0;
+    };
+    return inChild(enter, body);
 }
 
 void makeChain(int parent, std::size_t depth) {
     FileDescriptor current;
     for (std::size_t level = 0; level < depth; ++level) {
         const int above = level == 0 ? parent : current.get();
-        check(::mkdirat(above, "d", 0755), "mkdir");
-        FileDescriptor next = openDirectory(above, "d");
-        check(::mknodat(next.get(), "f", S_IFREG | 0644, 0), "mknod");
-        current = std::move(next);
+        checked(::mkdirat(above, "d", 0755), "mkdir");
+        current = openDirectory(above, "d");
+        checked(::mknodat(current.get(), "f", S_IFREG | 0644, 0), "mknod");
     }
 }
 
@@ -99,22 +110,17 @@ std::string chainPath(std::size_t depth) {
     return path;
 }
 
-World::World(const std::string& parent) : directory_(parent), root_(openDirectory(AT_FDCWD, directory_.path())) {
-    makeDirectory(fd(), "outside");
-    makeFile(fd(), "outside/file", secret, 0600);
-    makeDirectory(fd(), "outside/sub", 0700);
+World::World() : root_(openDirectory(directory_.path())) {
+    makeItems(fd(), {"outside/", "outside/sub/", "outside/e/", "outside/parking/", "outside/parking/keep/"});
+    checked(::fchmodat(fd(), "outside/sub", 0700, 0) | ::fchmodat(fd(), "outside/parking", 0777, 0), "chmod");
+    for (const char* file : {"file", "e/f", "parking/keep/f", "parking/f"})
+        makeFile(fd(), std::string("outside/") + file, secret, 0600);
     makeFile(fd(), "outside/sub/f", secret, 0640);
-    makeDirectory(fd(), "outside/e");
-    makeFile(fd(), "outside/e/f", secret, 0600);
-    makeDirectory(fd(), "outside/parking", 0777);
-    makeDirectory(fd(), "outside/parking/keep");
-    makeFile(fd(), "outside/parking/keep/f", secret);
-    makeFile(fd(), "outside/parking/f", secret);
     makeFile(fd(), "outside/large", secret);
     const FileDescriptor large(::openat(fd(), "outside/large", O_RDWR | O_CLOEXEC));
-    check(::fallocate(large.get(), FALLOC_FL_KEEP_SIZE, 0, outsideBytes), "fallocate");
+    checked(::fallocate(large.get(), FALLOC_FL_KEEP_SIZE, 0, outsideBytes), "fallocate");
     if (::geteuid() == 0)
-        check(::fchownat(fd(), "outside/sub/f", 1234, 1234, AT_SYMLINK_NOFOLLOW), "chown");
+        checked(::fchownat(fd(), "outside/sub/f", 1234, 1234, AT_SYMLINK_NOFOLLOW), "chown");
     before_ = outside();
 }
 
@@ -123,48 +129,24 @@ void World::makeTree() {
     for (std::size_t depth = 1; depth <= chainDepth; ++depth) {
         const std::string directory = "tree/" + chainPath(depth);
         makeDirectory(fd(), directory);
-        makeFile(fd(), directory + "/f");
-        makeFile(fd(), directory + "/g");
-        makeLink(fd(), directory + "/l", upwards(depth + 1) + "outside");
-        makeDirectory(fd(), directory + "/e");
-        makeFile(fd(), directory + "/e/f");
-        makeFifo(fd(), directory + "/fifo");
+        const FileDescriptor made = openDirectory(fd(), directory);
+        makeItems(made.get(), {"f", "g", "l -> " + upwards(depth + 1) + "outside", "e/", "e/f", "fifo|"});
     }
     makeDirectory(fd(), "tree/wide");
+    const FileDescriptor wide = openDirectory(fd(), "tree/wide");
     for (std::size_t i = 0; i < wideCount; ++i) {
         const std::string number = std::to_string(i);
-        makeDirectory(fd(), "tree/wide/e" + number);
-        makeFile(fd(), "tree/wide/e" + number + "/f");
-        makeLink(fd(), "tree/wide/l" + number, upwards(2) + "outside");
-        makeFile(fd(), "tree/wide/f" + number);
-        makeFifo(fd(), "tree/wide/p" + number);
+        makeItems(wide.get(), {"e" + number + "/", "e" + number + "/f", "l" + number + " -> " + upwards(2) + "outside",
+                               "f" + number, "p" + number + "|"});
     }
 }
 
 bool World::confined(const std::function<void()>& body) {
-    constexpr int passed = 0;
-    constexpr int failed = 1;
-    constexpr int notPermitted = 2;
-    std::fflush(nullptr);
-    const pid_t child = ::fork();
-    check(child, "fork");
-    if (child == 0) {
-        if (::chroot(path().c_str()) != 0 || ::chdir("/") != 0)
-            ::_exit(notPermitted);
-        confined_ = true;
-        try {
-            body();
-        } catch (const std::exception& error) {
-            ADD_FAILURE() << error.what();
-        }
-        std::fflush(nullptr);
-        ::_exit(testing::Test::HasFailure() ? failed : passed);
-    }
-    int status = 0;
-    check(::waitpid(child, &status, 0), "waitpid");
-    EXPECT_TRUE(WIFEXITED(status)) << "ended by signal " << WTERMSIG(status);
-    EXPECT_NE(WEXITSTATUS(status), failed) << "see above";
-    return !WIFEXITED(status) || WEXITSTATUS(status) != notPermitted;
+    const auto enter = [this] {
+        confined_ = ::chroot(path().c_str()) == 0 && ::chdir("/") == 0;
+        return confined_;
+    };
+    return inChild(enter, body);
 }
 
 std::string World::outside() const {

@@ -3,31 +3,39 @@
 // change, and an owner of the tree who moves it about meanwhile.
 #pragma once
 
-#include "platform/FileDescriptor.h"
 #include "platform/linux/LinuxDisk.h"
 #include "support/FileTree.h"
+#include "support/Files.h"
 
 #include <atomic>
-#include <chrono>
 #include <functional>
 #include <string>
+#include <sys/stat.h>
 #include <thread>
 
 namespace zor::fs::test {
 
-/// Tests that repeat themselves take longer, and large trees are larger, with ZORVANE_TEST_LONG=1.
+using platform::FileDescriptor;
+using support::exists;
+using support::makeDirectory;
+using support::makeFifo;
+using support::makeFile;
+using support::makeItems;
+using support::makeLink;
+using support::openDirectory;
+using support::TemporaryDirectory;
+
+/// Races take longer, and large trees are larger, with ZORVANE_TEST_LONG=1.
 bool isLongRun();
-std::chrono::seconds raceTime();
-
+/// Calls `body` again and again for a while, until it is enough or fails; how often.
+std::size_t repeatForRace(const std::function<void()>& body, const std::function<bool()>& isEnough = nullptr);
 std::size_t openDescriptorCount();
+struct stat statusOf(int parent, const std::string& path);
+struct stat statusOf(const std::string& path);
 
-/// Throw std::system_error when they fail; `path` may have directories in it.
-platform::FileDescriptor openDirectory(int parent, const std::string& path);
-void makeDirectory(int parent, const std::string& path, mode_t mode = 0755);
-void makeFile(int parent, const std::string& path, const std::string& content = "x", mode_t mode = 0644);
-void makeLink(int parent, const std::string& path, const std::string& target);
-void makeFifo(int parent, const std::string& path);
-bool exists(int parent, const std::string& path);
+/// Runs `body` in a child with mounts of its own. False: not permitted here. What `body` expects in vain is a failure.
+bool inMountNamespace(const std::function<void()>& body);
+
 /// A chain of `depth` directories "d", the first in `parent`; each holds a file "f" as well.
 void makeChain(int parent, std::size_t depth);
 /// "a0", "a0/a1" and so on.
@@ -43,7 +51,7 @@ public:
     static constexpr const char* secret = "SECRET";
     static constexpr off_t outsideBytes = 8 * 1024 * 1024;
 
-    explicit World(const std::string& parent = "/dev/shm");
+    World();
 
     void makeTree();
     /// What changed outside the tree since the world was made; empty when nothing did.
@@ -51,9 +59,8 @@ public:
     [[nodiscard]] int fd() const { return root_.get(); }
     [[nodiscard]] std::string path() const { return confined_ ? "" : directory_.path(); }
 
-    /// Runs `body` in a child for which this world is the whole file system. A walk that is wrong and leaves the tree
-    /// would else take its mistake to the machine, as root. False: not permitted here. What `body` expects in vain is a
-    /// failure.
+    /// The same in a child for which this world is the whole file system. A walk that is wrong and leaves the tree
+    /// would else take its mistake to the machine, as root.
     bool confined(const std::function<void()>& body);
 
     platform::LinuxDisk disk{platform::Syncs::off};
@@ -61,9 +68,9 @@ public:
 private:
     [[nodiscard]] std::string outside() const;
 
-    support::TemporaryDirectory directory_;
+    TemporaryDirectory directory_;
     bool confined_ = false;
-    platform::FileDescriptor root_;
+    FileDescriptor root_;
     std::string before_;
 };
 

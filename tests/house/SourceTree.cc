@@ -1,6 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// Reads the checkout for the house tests. A lexer of a few states is enough here: what it has to know of C++ is where
-// comments and literals begin and end.
+// Reads the checkout for the house tests. What it has to know of C++ is where comments and literals begin and end.
 #include "house/SourceTree.h"
 
 #include <algorithm>
@@ -19,9 +18,8 @@ std::string checkoutRoot() {
 
 std::string readFile(const std::string& path) {
     std::ifstream stream(path, std::ios::binary);
-    if (!stream) {
+    if (!stream)
         throw std::runtime_error("cannot read " + path);
-    }
     return {std::istreambuf_iterator<char>(stream), {}};
 }
 
@@ -30,96 +28,56 @@ std::vector<SourceFile> filesBelow(const std::vector<std::string>& folders, cons
     std::vector<SourceFile> files;
     const auto take = [&](const std::filesystem::path& path) {
         const std::string name = path.string();
-        if (std::ranges::any_of(endings, [&](const std::string& ending) { return name.ends_with(ending); })) {
+        if (std::filesystem::is_regular_file(path) &&
+            std::ranges::any_of(endings, [&](const std::string& ending) { return name.ends_with(ending); }))
             files.push_back({name.substr(root.size()), readFile(name)});
-        }
     };
     for (const std::string& folder : folders) {
-        if (std::filesystem::is_regular_file(root + folder)) {
-            take(root + folder);
-        } else if (std::filesystem::is_directory(root + folder)) {
-            for (const auto& entry : std::filesystem::recursive_directory_iterator(root + folder)) {
-                if (entry.is_regular_file()) {
-                    take(entry.path());
-                }
-            }
-        }
+        take(root + folder);
+        if (std::filesystem::is_directory(root + folder))
+            for (const auto& entry : std::filesystem::recursive_directory_iterator(root + folder))
+                take(entry.path());
     }
     std::ranges::sort(files, {}, &SourceFile::path);
     return files;
 }
 
+bool isWordCharacter(char c) {
+    return std::isalnum(static_cast<unsigned char>(c)) != 0 || c == '_';
+}
+
+std::size_t literalEnd(std::string_view text, std::size_t at) {
+    const char quote = text[at++];
+    while (at < text.size() && text[at] != quote && text[at] != '\n')
+        at += text[at] == '\\' ? 2 : 1;
+    return std::min(at + 1, text.size());
+}
+
 std::string withoutComments(std::string_view text, Literals literals) {
-    enum class State { code, lineComment, blockComment, string, character, rawString };
-    State state = State::code;
     std::string out(text);
-    std::string rawEnd;
-    const auto blank = [&](std::size_t at) {
-        if (out[at] != '\n') {
-            out[at] = ' ';
-        }
+    const auto blank = [&](std::size_t from, std::size_t to) {
+        for (; from < to; ++from)
+            out[from] = out[from] == '\n' ? '\n' : ' ';
     };
-    for (std::size_t i = 0; i < text.size(); ++i) {
-        const std::string_view rest = text.substr(i);
-        switch (state) {
-        case State::code:
-            if (rest.starts_with("//")) {
-                state = State::lineComment;
-                blank(i);
-            } else if (rest.starts_with("/*")) {
-                state = State::blockComment;
-                blank(i);
-                blank(++i);
-            } else if (rest.starts_with("R\"") && rest.find('(') != rest.npos) {
-                const std::size_t open = rest.find('(');
-                rawEnd = ")" + std::string(rest.substr(2, open - 2)) + "\"";
-                state = State::rawString;
-                i += open;
-            } else if (rest.front() == '"') {
-                state = State::string;
-            } else if (rest.front() == '\'' && (i == 0 || std::isalnum(static_cast<unsigned char>(text[i - 1])) == 0)) {
-                // A quote behind a digit separates digits.
-                state = State::character;
-            }
-            break;
-        case State::lineComment:
-            if (rest.front() == '\n') {
-                state = State::code;
-            }
-            blank(i);
-            break;
-        case State::blockComment:
-            if (rest.starts_with("*/")) {
-                state = State::code;
-                blank(i++);
-            }
-            blank(i);
-            break;
-        case State::string:
-        case State::character:
-            if (rest.front() == (state == State::string ? '"' : '\'') || rest.front() == '\n') {
-                state = State::code;
-                break;
-            }
-            if (literals == Literals::blank) {
-                blank(i);
-            }
-            if (rest.front() == '\\' && i + 1 < text.size()) {
-                ++i;
-                if (literals == Literals::blank) {
-                    blank(i);
-                }
-            }
-            break;
-        case State::rawString:
-            if (rest.starts_with(rawEnd)) {
-                state = State::code;
-                i += rawEnd.size() - 1;
-            } else if (literals == Literals::blank) {
-                blank(i);
-            }
-            break;
+    const auto behind = [&](std::string_view ending, std::size_t from) {
+        const std::size_t found = text.find(ending, from);
+        return found == text.npos ? text.size() : found + ending.size();
+    };
+    for (std::size_t at = 0, end = 0; at < text.size(); at = end) {
+        const std::string_view rest = text.substr(at);
+        end = at + 1;
+        if (rest.starts_with("//") || rest.starts_with("/*")) {
+            end = rest[1] == '/' ? std::min(text.find('\n', at), text.size()) : behind("*/", at + 2);
+            blank(at, end);
+            continue;
         }
+        // A quote behind a digit separates digits.
+        if (rest.starts_with("R\"") && rest.find('(') != rest.npos)
+            end = behind(")" + std::string(rest.substr(2, rest.find('(') - 2)) + "\"", at);
+        else if (rest[0] == '"' || (rest[0] == '\'' && (at == 0 || !isWordCharacter(text[at - 1]))))
+            end = literalEnd(text, at);
+        if (literals == Literals::blank)
+            blank(at + 1, end - 1);
     }
     return out;
 }
@@ -128,8 +86,9 @@ std::set<std::string> testNames() {
     static const std::regex macro(R"(TEST(?:_F|_P)?\((\w+), (\w+)\))");
     std::set<std::string> names;
     for (const SourceFile& file : filesBelow({"tests"}, {"Test.cc"}))
-        for (std::sregex_iterator at(file.text.begin(), file.text.end(), macro); at != std::sregex_iterator(); ++at)
-            names.insert((*at)[1].str() + "." + (*at)[2].str());
+        for (const std::string_view line : splitLines(file.text))
+            if (std::cmatch name; line.starts_with("TEST") && std::regex_search(line.begin(), line.end(), name, macro))
+                names.insert(name[1].str() + "." + name[2].str());
     return names;
 }
 
@@ -143,26 +102,23 @@ std::vector<std::string_view> splitLines(std::string_view text) {
     return lines;
 }
 
+std::string joinLines(const std::vector<std::string>& lines) {
+    std::string text;
+    for (const std::string& line : lines)
+        text += line + "\n";
+    return text;
+}
+
 std::vector<Include> quotedIncludes(std::string_view text) {
+    static const std::regex directive("\\s*#\\s*include\\s*\"([^\"]*)\".*");
     const std::string code = withoutComments(text, Literals::keep);
     std::vector<Include> includes;
     int number = 0;
-    for (std::string_view line : splitLines(code)) {
+    for (const std::string_view line : splitLines(code)) {
         ++number;
-        const std::size_t hash = line.find_first_not_of(" \t");
-        if (hash == line.npos || line[hash] != '#') {
-            continue;
-        }
-        line.remove_prefix(hash + 1);
-        const std::size_t word = line.find_first_not_of(" \t");
-        if (word == line.npos || !line.substr(word).starts_with("include")) {
-            continue;
-        }
-        const std::size_t open = line.find('"');
-        const std::size_t close = line.find('"', open == line.npos ? open : open + 1);
-        if (close != line.npos) {
-            includes.push_back({std::string(line.substr(open + 1, close - open - 1)), number});
-        }
+        std::cmatch name;
+        if (line.find('#') != line.npos && std::regex_match(line.begin(), line.end(), name, directive))
+            includes.push_back({name[1], number});
     }
     return includes;
 }

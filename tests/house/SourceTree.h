@@ -29,6 +29,11 @@ std::vector<SourceFile> filesBelow(const std::vector<std::string>& folders, cons
 
 std::string readFile(const std::string& path);
 
+/// Of a name; digits too.
+bool isWordCharacter(char c);
+/// Behind a literal whose quote is at `at`; a line's end ends it, too.
+std::size_t literalEnd(std::string_view text, std::size_t at);
+
 /// The text with comments blanked and, unless kept, the insides of literals too. Lines keep their numbers.
 enum class Literals { keep, blank };
 std::string withoutComments(std::string_view text, Literals literals);
@@ -40,5 +45,7 @@ std::vector<Include> quotedIncludes(std::string_view text);
 std::set<std::string> testNames();
 
 std::vector<std::string_view> splitLines(std::string_view text);
+/// One line for each.
+std::string joinLines(const std::vector<std::string>& lines);
 
 } // namespace zor::house

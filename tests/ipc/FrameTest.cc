@@ -9,7 +9,7 @@
 namespace zor::ipc {
 namespace {
 
-// Goal: the header's bytes are those that other programs write and read. Method: bytes written by hand.
+// The header's bytes are those that other programs write and read.
 TEST(Frame, HeaderBytes) {
     const std::array<std::uint8_t, frameHeaderBytes> bytes = {0x01, 0x02, 0x10, 0x00, 0x01, 0x00, 0x00, 0x00,
                                                               0x88, 0x77, 0x66, 0x55, 0x44, 0x33, 0x22, 0x11};
@@ -22,7 +22,7 @@ TEST(Frame, HeaderBytes) {
     EXPECT_EQ(written, bytes);
 }
 
-// Goal: each side takes exactly what the other may send. Method: lengths and flags around every limit.
+// Each side takes exactly what the other may send: lengths and flags around every limit.
 TEST(Frame, WhatEachSideTakes) {
     struct Row {
         std::uint32_t payloadBytes;
@@ -52,7 +52,7 @@ TEST(Frame, WhatEachSideTakes) {
     }
 }
 
-// Goal: a UUID is 16 bytes of data or nothing, and its text is exact. Method: values and texts that are nearly one.
+// A UUID is 16 bytes of data or nothing, and its text is exact.
 TEST(Uuid, ValuesAndText) {
     const UuidBytes uuid = {0x00, 0x11, 0x22, 0x33, 0x44, 0x55, 0x66, 0x77,
                             0x88, 0x99, 0xAA, 0xBB, 0xCC, 0xDD, 0xEE, 0xFF};
@@ -75,8 +75,7 @@ TEST(Uuid, ValuesAndText) {
         EXPECT_FALSE(uuidOfText(wrong)) << wrong;
 }
 
-// Goal: the numbers that metadata files and messages carry keep their names. Method: the table, and names that are
-// none.
+// The numbers that metadata files and messages carry keep their names.
 TEST(ContainerClasses, NumbersAndNames) {
     EXPECT_EQ(containerClassOfName("Data/KolvexPlugin"), ContainerClass::dataKolvexPlugin);
     EXPECT_EQ(containerClassOfName("Shared/SystemGroup"), ContainerClass::sharedSystemGroup);

@@ -17,7 +17,7 @@ std::expected<RegistryEntry, std::string> parse(const std::string& text) {
 
 const std::string executable = "<key>Executable</key><string>/usr/bin/agent</string>";
 
-// Goal: a file that is not wholly understood grants nothing. Method: one fault a row in a file that is otherwise good.
+// A file that is not wholly understood grants nothing.
 TEST(IdentityFile, RefusesWhatItDoesNotUnderstand) {
     ASSERT_TRUE(parse(file(executable)));
     const std::vector<std::string> wrong = {
@@ -53,7 +53,7 @@ TEST(IdentityFile, RefusesWhatItDoesNotUnderstand) {
     }
 }
 
-// Goal: power needs a uid that was named, or the owner's. Method: what is granted, by which uids get it.
+// Power needs a uid that was named, or the owner's.
 TEST(IdentityFile, FencesPowers) {
     const std::string prefix = "com.veltra.private.Zorvane.";
     const auto entitled = [&](const std::string& key, const std::string& value) {
@@ -89,8 +89,7 @@ TEST(IdentityFile, FencesPowers) {
     }
 }
 
-// Goal: only a unit of the system manager counts. Method: paths as the kernel writes them, and those a user can bring
-// about.
+// Only a unit of the system manager counts, not one that a user can bring about.
 TEST(CgroupUnit, IsTheSystemManagersUnit) {
     const std::vector<std::pair<std::string, std::string>> cases = {
         {"0::/system.slice/installer.service\n", "installer.service"},

@@ -1,21 +1,19 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/linux/LinuxPlatform.h"
-#include "platform/PeerProcess.h"
-#include "platform/linux/Names.h"
+#include "platform/TestRoot.h"
 #include "support/ProcessResources.h"
+
+#include <atomic>
 
 namespace zor::platform {
 namespace {
 
-// Goal: one daemon a root, several roots a process, and everything given back at the end. Method: open, use each role
-// that has a thread or a descriptor, open again.
+// One daemon a root, several roots a process, and everything given back at the end, twice.
 TEST(LinuxPlatform, OwnsOneRootAtATime) {
     const TestRoot first;
     const TestRoot second;
-    {
-        // What the C library and the loop make once.
-        ASSERT_TRUE(LinuxPlatform::open({.rootDirectory = first.path("")}));
-    }
+    // What the C library and the loop make once.
+    ASSERT_TRUE(LinuxPlatform::open({.rootDirectory = first.path("")}));
     const support::ProcessResources before;
     for (int round = 0; round < 2; ++round) {
         auto opened = LinuxPlatform::open({.rootDirectory = first.path("")});

@@ -1,20 +1,14 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "platform/ListenerWorld.h"
-
 #include "platform/BlockingScope.h"
-
-#include <gtest/gtest.h>
+#include "platform/ListenerWorld.h"
 
 #include <condition_variable>
 #include <cstdlib>
 #include <ctime>
-#include <dirent.h>
-#include <fstream>
-#include <memory>
+#include <filesystem>
 #include <random>
-#include <thread>
 
-namespace zor::platform::test {
+namespace zor::platform {
 namespace {
 
 enum class Announced { yes, no };
@@ -33,9 +27,12 @@ public:
             --passes_;
         --inside_;
     }
-    int inside() {
-        const std::lock_guard lock(mutex_);
-        return inside_;
+    /// Waits until so many are held.
+    bool holds(int count) {
+        return eventually([&] {
+            const std::lock_guard lock(mutex_);
+            return inside_ == count;
+        });
     }
     void letOneThrough() {
         const std::lock_guard lock(mutex_);
@@ -73,18 +70,22 @@ struct Blocked {
     }
     void add(int count) {
         for (int i = 0; i < count; ++i) {
-            clients.push_back(std::make_unique<RawClient>(world.socketPath()));
-            ASSERT_TRUE(clients.back()->send(blockRequest, 1));
+            clients.push_back(world.connect());
+            ASSERT_TRUE(clients.back().send(blockRequest, 1));
         }
+    }
+    void letGo() {
+        gate.open();
+        for (RawClient& client : clients)
+            EXPECT_TRUE(client.receives(1, blockRequest));
     }
     ListenerWorld& world;
     Gate gate;
-    std::vector<std::unique_ptr<RawClient>> clients;
+    std::vector<RawClient> clients;
 };
 
-// Goal: handlers that wait never stop the others, up to the last thread; when they are done the threads go away again.
-// Method: as many blocked handlers as leave one thread over, announced or found out by the watcher; then all are let
-// go.
+// Handlers that wait, announced or found out by the watcher, never stop the others, up to the last thread; when they
+// are done the threads go away again.
 TEST(ListenerPool, GrowsWhileHandlersWaitAndShrinksAfterwards) {
     for (const Announced announced : {Announced::yes, Announced::no}) {
         SCOPED_TRACE(announced == Announced::yes ? "announced" : "found out");
@@ -92,27 +93,36 @@ TEST(ListenerPool, GrowsWhileHandlersWaitAndShrinksAfterwards) {
         world.limits.threadsRunning = 2;
         world.limits.threadIdle = std::chrono::milliseconds(200);
         Blocked blocked(world, announced);
-        RawClient other(world.socketPath());
+        RawClient other = world.connect();
         for (int count = 1; count < 64; ++count) {
             blocked.add(1);
             if (count % 16 == 0 || count > 60 || count < 4) {
                 ASSERT_TRUE(other.isServed()) << count;
             }
         }
-        ASSERT_TRUE(eventually([&] { return blocked.gate.inside() == 63; }));
+        ASSERT_TRUE(blocked.gate.holds(63));
         ASSERT_TRUE(other.isServed());
-        EXPECT_EQ(world.listener().counters().threads, 64U);
-        blocked.gate.open();
-        for (const auto& client : blocked.clients)
-            EXPECT_TRUE(client->receive());
-        EXPECT_TRUE(eventually([&] { return world.listener().counters().threads == 2; }));
-        EXPECT_EQ(world.listener().counters().threadsBlocked, 0U);
+        EXPECT_EQ(world.counters().threads, 64U);
+        if (announced == Announced::yes) {
+            // With every thread blocked a request waits, and is not lost.
+            blocked.add(1);
+            ASSERT_TRUE(blocked.gate.holds(64));
+            const int before = world.counts.messages;
+            ASSERT_TRUE(other.send(numbered(1), 1));
+            std::this_thread::sleep_for(std::chrono::milliseconds(50));
+            EXPECT_EQ(world.counts.messages, before);
+            blocked.gate.letOneThrough();
+            EXPECT_TRUE(other.receives(1, numbered(1)));
+        }
+        blocked.letGo();
+        EXPECT_EQ(world.counters().threadsMost, 64U);
+        EXPECT_TRUE(eventually([&] { return world.counters().threads == 2; }));
+        EXPECT_EQ(world.counters().threadsBlocked, 0U);
         EXPECT_TRUE(other.isServed());
     }
 }
 
-// Goal: the pool reacts to what workers say at once, without the watcher. Method: a tick of an hour, and the three ways
-// in which work can be left without a worker.
+// With a tick of an hour: the pool reacts at once in the three ways in which work can be left without a worker.
 TEST(ListenerPool, GrowsAtOnceWhenWorkersSaySo) {
     ListenerWorld world;
     world.limits.threadsRunning = 2;
@@ -121,79 +131,53 @@ TEST(ListenerPool, GrowsAtOnceWhenWorkersSaySo) {
     Gate blocked;
     std::atomic<int> floodServed{0};
     world.start([&](PeerConnection&, ServiceEvent& event) {
-        const std::uint64_t number = event.request.unsignedInteger("Number").value_or(0);
+        if (!event.reply) {
+            ++floodServed;
+            return;
+        }
+        const std::uint64_t number = *event.request.unsignedInteger("Number");
         if (number == 1 || number == 3)
             working.wait(Announced::no);
         if (number == 1 || number == 2)
             blocked.wait(Announced::yes);
-        if (number == 4)
-            ++floodServed;
-        if (event.reply)
-            event.reply->send(event.request);
+        event.reply->send(event.request);
     });
-    std::vector<std::unique_ptr<RawClient>> clients;
+    std::vector<RawClient> clients;
     const auto request = [&](std::uint64_t number) {
-        clients.push_back(std::make_unique<RawClient>(world.socketPath()));
-        ASSERT_TRUE(clients.back()->send(numbered(number), number));
+        clients.push_back(world.connect());
+        ASSERT_TRUE(clients.back().send(numbered(number), number));
     };
-    RawClient other(world.socketPath());
+    RawClient other = world.connect();
     // Nobody waits any more when these two say that they block.
     request(1);
     request(1);
-    ASSERT_TRUE(eventually([&] { return working.inside() == 2; }));
+    ASSERT_TRUE(working.holds(2));
     working.letOneThrough();
-    ASSERT_TRUE(eventually([&] { return blocked.inside() == 1; }));
+    ASSERT_TRUE(blocked.holds(1));
     EXPECT_TRUE(other.isServed());
     working.letOneThrough();
-    ASSERT_TRUE(eventually([&] { return blocked.inside() == 2; }));
+    ASSERT_TRUE(blocked.holds(2));
     EXPECT_TRUE(other.isServed());
     // One blocks while another waits; then that one works, and another may run beside it.
     request(2);
-    ASSERT_TRUE(eventually([&] { return blocked.inside() == 3; }));
+    ASSERT_TRUE(blocked.holds(3));
     request(3);
-    ASSERT_TRUE(eventually([&] { return working.inside() == 1; }));
+    ASSERT_TRUE(working.holds(1));
     EXPECT_TRUE(other.isServed());
-    EXPECT_EQ(world.listener().counters().threads, 5U);
+    EXPECT_EQ(world.counters().threads, 5U);
     // Requests that wait for their turn are taken over when the worker that left them there gets busy.
-    plist::Data flood;
-    for (int i = 0; i < 2000; ++i) {
-        const plist::Data frame = frameOf(numbered(4), 0, 0);
-        flood.insert(flood.end(), frame.begin(), frame.end());
-    }
-    std::thread sender([&] { EXPECT_TRUE(other.send(flood)); });
+    std::thread sender([&] { EXPECT_TRUE(other.send(burstOf(2000, 0))); });
     working.letOneThrough();
     request(3);
-    EXPECT_TRUE(eventually([&] { return floodServed == 2000 && working.inside() == 1; }));
+    EXPECT_TRUE(eventually([&] { return floodServed == 2000; }) && working.holds(1));
     sender.join();
     working.open();
     blocked.open();
-    for (const auto& client : clients)
-        EXPECT_TRUE(client->receive());
+    for (RawClient& client : clients)
+        EXPECT_TRUE(client.receive());
 }
 
-// Goal: at the limit requests wait, and none is lost. Method: one more request than there are threads, all blocked.
-TEST(ListenerPool, WorkWaitsWhenEveryThreadIsBlocked) {
-    ListenerWorld world;
-    world.limits.threadsRunning = 2;
-    world.limits.threadsMax = 6;
-    Blocked blocked(world, Announced::yes);
-    blocked.add(6);
-    ASSERT_TRUE(eventually([&] { return blocked.gate.inside() == 6; }));
-    RawClient other(world.socketPath());
-    ASSERT_TRUE(other.send(numbered(1), 1));
-    blocked.add(1);
-    std::this_thread::sleep_for(std::chrono::milliseconds(100));
-    EXPECT_EQ(world.counts.messages, 6);
-    blocked.gate.letOneThrough();
-    EXPECT_TRUE(other.receive());
-    blocked.gate.open();
-    for (const auto& client : blocked.clients)
-        EXPECT_TRUE(client->receive());
-    EXPECT_EQ(world.listener().counters().threadsMost, 6U);
-}
-
-// Goal: handlers that only compute never make the pool grow. Method: more clients than threads, each request computes
-// for several ticks of the watcher.
+// Handlers that only compute, for several ticks of the watcher, never make the pool grow.
 TEST(ListenerPool, ComputingDoesNotMakeItGrow) {
     ListenerWorld world;
     world.limits.threadsRunning = 2;
@@ -206,18 +190,15 @@ TEST(ListenerPool, ComputingDoesNotMakeItGrow) {
         while ((now.tv_sec - begin.tv_sec) * 1'000'000'000 + now.tv_nsec - begin.tv_nsec < 40'000'000);
         event.reply->send(event.request);
     });
-    std::vector<std::unique_ptr<RawClient>> clients;
-    for (int i = 0; i < 12; ++i) {
-        clients.push_back(std::make_unique<RawClient>(world.socketPath()));
-        ASSERT_TRUE(clients.back()->send(numbered(1), 1));
-    }
-    for (const auto& client : clients)
-        EXPECT_TRUE(client->receive());
-    EXPECT_EQ(world.listener().counters().threadsMost, 2U);
+    std::vector<RawClient> clients = world.connect(12);
+    for (RawClient& client : clients)
+        ASSERT_TRUE(client.send(numbered(1), 1));
+    for (RawClient& client : clients)
+        EXPECT_TRUE(client.receive());
+    EXPECT_EQ(world.counters().threadsMost, 2U);
 }
 
-// Goal: many short waits of many clients lose no request and end in the same small pool. Method: handlers that open
-// scopes inside scopes, some waiting, some not, under load; it is the counters' balance that is tested.
+// Scopes inside scopes, some waiting, some not, under load, lose no request and end in the same small pool.
 TEST(ListenerPool, CountsStayRightUnderMixedLoad) {
     ListenerWorld world;
     world.limits.threadsRunning = 2;
@@ -233,127 +214,109 @@ TEST(ListenerPool, CountsStayRightUnderMixedLoad) {
         }
         event.reply->send(event.request);
     });
-    std::vector<std::thread> threads;
-    for (int i = 0; i < 8; ++i)
-        threads.emplace_back([&] {
-            RawClient client(world.socketPath());
-            for (std::uint64_t number = 0; number < 400; ++number) {
-                ASSERT_TRUE(client.send(numbered(number), number));
-                const std::optional<Reply> reply = client.receive();
-                ASSERT_TRUE(reply);
-                ASSERT_EQ(reply->id, number);
-            }
-        });
-    for (std::thread& thread : threads)
-        thread.join();
+    inThreads(8, [&](unsigned) {
+        RawClient client = world.connect();
+        for (std::uint64_t number = 0; number < 400; ++number) {
+            ASSERT_TRUE(client.send(numbered(number), number));
+            ASSERT_TRUE(client.receives(number, numbered(number)));
+        }
+    });
     EXPECT_TRUE(world.isAtRest());
-    EXPECT_TRUE(eventually([&] { return world.listener().counters().threads == 2; }));
-    EXPECT_EQ(world.listener().counters().threadsBlocked, 0U);
-    EXPECT_EQ(world.listener().counters().messages, 8U * 400);
+    EXPECT_TRUE(eventually([&] { return world.counters().threads == 2; }));
+    EXPECT_EQ(world.counters().threadsBlocked, 0U);
+    EXPECT_EQ(world.counters().messages, 8U * 400);
 }
 
-// Goal: connections that end at any moment leave no charge, no event and no reply to a later one of the same object.
-// Method: clients that leave at random points while replies come at once, late from another thread, large, or never.
+/// Answers requests from a thread of its own.
+class LateReplier {
+public:
+    explicit LateReplier(std::size_t bytes) : answer_{{"Large", plist::Data(bytes, 2)}}, thread_([this] { run(); }) {}
+    ~LateReplier() {
+        {
+            const std::lock_guard lock(mutex_);
+            done_ = true;
+        }
+        changed_.notify_one();
+    }
+    void take(const ServiceEvent& event) {
+        const std::lock_guard lock(mutex_);
+        late_.push_back(event.reply);
+        changed_.notify_one();
+    }
+
+private:
+    void run() {
+        std::unique_lock lock(mutex_);
+        while (!done_) {
+            changed_.wait(lock, [this] { return done_ || !late_.empty(); });
+            const auto taken = std::exchange(late_, {});
+            lock.unlock();
+            for (const auto& reply : taken)
+                reply->send(answer_);
+            lock.lock();
+        }
+    }
+
+    const plist::Dictionary answer_;
+    std::mutex mutex_;
+    std::condition_variable changed_;
+    std::vector<std::shared_ptr<ReplyChannel>> late_;
+    bool done_ = false;
+    std::jthread thread_;
+};
+
+// Clients that leave at any moment, while replies come at once, late, large or never, leave no charge, no event and no
+// reply to a later connection of the same object.
 TEST(ListenerPool, ConnectionsEndWhileRepliesAreUnderWay) {
     ListenerWorld world;
     world.limits.outputBytesPaused = 50'000;
-    std::mutex mutex;
-    std::vector<std::shared_ptr<ReplyChannel>> late;
-    std::atomic<bool> done{false};
+    LateReplier replier(70'000);
     world.start([&](PeerConnection& connection, ServiceEvent& event) {
-        switch (*event.request.unsignedInteger("Number") % 6) {
-        case 0: {
-            const std::lock_guard lock(mutex);
-            late.push_back(event.reply);
-            return;
-        }
-        case 1:
-            event.reply->send(
-                {{"Number", event.request.unsignedInteger("Number").value()}, {"Large", plist::Data(100'000, 1)}});
-            return;
-        case 2:
-            if (*event.request.unsignedInteger("Number") % 5 == 0)
-                connection.cancel();
-            return;
-        default:
+        const std::uint64_t number = *event.request.unsignedInteger("Number");
+        if (number % 6 == 0)
+            replier.take(event);
+        else if (number % 6 == 1)
+            event.reply->send({{"Large", plist::Data(100'000, 1)}});
+        else if (number % 6 > 2)
             event.reply->send(event.request);
+        else if (number % 5 == 0)
+            connection.cancel();
+    });
+    inThreads(6, [&](unsigned seed) {
+        std::mt19937_64 random(seed);
+        for (int life = 0; life < 150; ++life) {
+            RawClient client = world.connect();
+            const std::uint64_t first = random() << 32U;
+            // Some wait for late replies, each of which finds the connection just let go, or just taken.
+            for (std::uint64_t i = 0; i < 5 && life % 3 == 0; ++i)
+                ASSERT_TRUE(client.send(numbered(0), first + i));
+            for (std::uint64_t i = 0; i < 5 && life % 3 == 0; ++i)
+                ASSERT_TRUE(client.receive());
+            const std::uint64_t requests = random() % 12;
+            for (std::uint64_t i = 0; i < requests; ++i)
+                if (!client.send(numbered((random() & 0xFF)), first + i))
+                    break;
+            for (std::uint64_t replies = random() % 3; replies > 0 && requests > 4; --replies) {
+                const std::optional<Reply> reply = client.receiveIfAny();
+                EXPECT_TRUE(!reply || (reply->id >= first && reply->id < first + requests));
+            }
         }
     });
-    std::thread replier([&] {
-        while (!done) {
-            std::vector<std::shared_ptr<ReplyChannel>> taken;
-            {
-                const std::lock_guard lock(mutex);
-                taken.swap(late);
-            }
-            for (const auto& reply : taken)
-                reply->send({{"Large", plist::Data(70'000, 2)}});
-            std::this_thread::yield();
-        }
-    });
-    std::vector<std::thread> clients;
-    for (std::uint64_t seed = 0; seed < 6; ++seed)
-        clients.emplace_back([&, seed] {
-            std::mt19937_64 random(seed);
-            for (int life = 0; life < 150; ++life) {
-                RawClient client(world.socketPath());
-                const std::uint64_t first = random() << 32U;
-                // Some wait for late replies, each of which finds the connection just let go, or just taken.
-                for (std::uint64_t i = 0; i < 5 && life % 3 == 0; ++i)
-                    ASSERT_TRUE(client.send(numbered(0), first + i));
-                for (std::uint64_t i = 0; i < 5 && life % 3 == 0; ++i)
-                    ASSERT_TRUE(client.receive());
-                const std::uint64_t requests = random() % 12;
-                for (std::uint64_t i = 0; i < requests; ++i)
-                    if (!client.send(numbered((random() & 0xFF)), first + i))
-                        break;
-                for (std::uint64_t replies = random() % 3; replies > 0 && requests > 4; --replies) {
-                    const std::optional<Reply> reply = client.receiveIfAny();
-                    EXPECT_TRUE(!reply || (reply->id >= first && reply->id < first + requests));
-                }
-            }
-        });
-    for (std::thread& client : clients)
-        client.join();
     EXPECT_TRUE(world.isAtRest());
-    done = true;
-    replier.join();
-    EXPECT_EQ(world.counts.invalids, static_cast<int>(world.listener().counters().connectionsAccepted));
+    EXPECT_EQ(world.counts.invalids, static_cast<int>(world.counters().connectionsAccepted));
     EXPECT_EQ(world.counts.others, 0);
 }
 
-// Goal: a reply from another thread that arms the connection just when its worker lets it go neither gets lost nor
-// brings a second worker in. Method: bursts of requests, each answered late and with more than the socket takes; the
-// peer waits for all answers of a burst, so that nothing else would wake the connection. More rounds with
-// ZORVANE_TEST_LONG.
+// A reply that arms the connection just when its worker lets it go neither gets lost nor brings a second worker in:
+// each is more than the socket takes, and nothing else would wake the connection. More rounds with ZORVANE_TEST_LONG.
 TEST(ListenerPool, LateRepliesMeetTheWorkerThatLetsGo) {
     ListenerWorld world;
     world.limits.threadsRunning = 3;
-    std::mutex mutex;
-    std::condition_variable changed;
-    std::vector<std::shared_ptr<ReplyChannel>> late;
-    bool done = false;
-    world.start([&](PeerConnection&, ServiceEvent& event) {
-        const std::lock_guard lock(mutex);
-        late.push_back(event.reply);
-        changed.notify_one();
-    });
-    const plist::Dictionary large = {{"Large", plist::Data(150'000, 2)}};
-    std::thread replier([&] {
-        std::unique_lock lock(mutex);
-        while (!done) {
-            changed.wait(lock, [&] { return done || !late.empty(); });
-            std::vector<std::shared_ptr<ReplyChannel>> taken;
-            taken.swap(late);
-            lock.unlock();
-            for (const auto& reply : taken)
-                reply->send(large);
-            lock.lock();
-        }
-    });
-    RawClient client(world.socketPath());
+    LateReplier replier(150'000);
+    world.start([&](PeerConnection&, ServiceEvent& event) { replier.take(event); });
+    RawClient client = world.connect();
     const int rounds = std::getenv("ZORVANE_TEST_LONG") ? 20'000 : 500;
-    for (int round = 0; round < rounds && !testing::Test::HasFailure(); ++round) {
+    for (int round = 0; round < rounds; ++round) {
         constexpr std::uint64_t burst = 4;
         for (std::uint64_t i = 0; i < burst; ++i)
             ASSERT_TRUE(client.send(numbered(i), i));
@@ -362,45 +325,34 @@ TEST(ListenerPool, LateRepliesMeetTheWorkerThatLetsGo) {
     }
     client.close();
     EXPECT_TRUE(world.isAtRest());
-    {
-        const std::lock_guard lock(mutex);
-        done = true;
-        changed.notify_one();
-    }
-    replier.join();
 }
 
 std::uint64_t switchesOfListenerThreads() {
     std::uint64_t sum = 0;
-    DIR* tasks = ::opendir("/proc/self/task");
-    while (const dirent* task = ::readdir(tasks)) {
-        std::ifstream status("/proc/self/task/" + std::string(task->d_name) + "/status");
+    for (const auto& task : std::filesystem::directory_iterator("/proc/self/task")) {
+        std::ifstream status(task.path() / "status");
         bool ours = false;
         for (std::string line; std::getline(status, line);) {
             if (line.starts_with("Name:"))
-                ours = line.find("listener") != std::string::npos;
+                ours = line.contains("listener");
             if (ours && line.starts_with("voluntary_ctxt_switches:"))
                 sum += std::stoull(line.substr(line.find(':') + 1));
         }
     }
-    ::closedir(tasks);
     return sum;
 }
 
-// Goal: an idle listener runs no code at all, also after it has been busy. Method: the context switches of its threads
-// do not change while nothing happens.
+// An idle listener runs no code at all, also after it has been busy: its threads' context switches do not change.
 TEST(ListenerPool, IdleCostsNothing) {
     ListenerWorld world;
     world.limits.threadsRunning = 2;
     world.limits.threadIdle = std::chrono::milliseconds(50);
     Blocked blocked(world, Announced::no);
     blocked.add(4);
-    RawClient other(world.socketPath());
+    RawClient other = world.connect();
     EXPECT_TRUE(other.isServed());
-    blocked.gate.open();
-    for (const auto& client : blocked.clients)
-        EXPECT_TRUE(client->receive());
-    ASSERT_TRUE(eventually([&] { return world.listener().counters().threads == 2; }));
+    blocked.letGo();
+    ASSERT_TRUE(eventually([&] { return world.counters().threads == 2; }));
     std::this_thread::sleep_for(std::chrono::milliseconds(100));
     const std::uint64_t before = switchesOfListenerThreads();
     EXPECT_GT(before, 0U);
@@ -409,4 +361,4 @@ TEST(ListenerPool, IdleCostsNothing) {
 }
 
 } // namespace
-} // namespace zor::platform::test
+} // namespace zor::platform

@@ -1,43 +1,159 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the tests of the listener stand on: a listener over its own socket with a handler that the test gives, peers
-// that are what the kernel says, and raw clients that may send any bytes.
+// What the tests of sockets stand on: a listener over its own socket with a handler that the test gives, peers that are
+// what the kernel says, and raw clients that may send any bytes.
 #pragma once
 
 #include "ipc/Frame.h"
-#include "platform/FileDescriptor.h"
+#include "platform/TestRoot.h"
 #include "platform/linux/LinuxServiceListener.h"
-#include "plist/Value.h"
+#include "plist/Binary.h"
 
+#include <algorithm>
 #include <atomic>
-#include <chrono>
-#include <cstdint>
-#include <functional>
-#include <memory>
+#include <cstring>
 #include <mutex>
-#include <optional>
+#include <poll.h>
 #include <set>
-#include <string>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <vector>
 
-namespace zor::platform::test {
+namespace zor::platform {
 
 /// Peers as SO_PEERCRED tells them.
 class KernelIdentity final : public PeerIdentity {
 public:
-    std::unique_ptr<Peer> peerOfSocket(int socket) override;
+    std::unique_ptr<Peer> peerOfSocket(int socket) override {
+        ucred credentials = {};
+        socklen_t length = sizeof credentials;
+        if (!knowsPeers || ::getsockopt(socket, SOL_SOCKET, SO_PEERCRED, &credentials, &length) != 0)
+            return nullptr;
+        return std::make_unique<KernelPeer>(*this, credentials);
+    }
     bool ownsRoot(uid_t) const override { return everybodyOwnsRoot; }
 
     bool everybodyOwnsRoot = true;
     std::atomic<bool> knowsPeers{true};
+    /// What every peer is granted.
+    std::atomic<bool> kernelAgent{false};
     /// Peers that exist; each connection has one until it has ended.
     std::atomic<int> peers{0};
+
+private:
+    class KernelPeer final : public Peer {
+    public:
+        KernelPeer(KernelIdentity& owner, const ucred& credentials) : owner_(owner), credentials_(credentials) {
+            ++owner_.peers;
+        }
+        ~KernelPeer() override { --owner_.peers; }
+        Identity identify(Explain) override {
+            return {.pid = credentials_.pid,
+                    .effectiveUserId = credentials_.uid,
+                    .grant = std::make_shared<IdentityGrant>(IdentityGrant{.kernelAgent = owner_.kernelAgent}),
+                    .explanation = {}};
+        }
+        pid_t pid() const override { return credentials_.pid; }
+        uid_t kernelUserId() const override { return credentials_.uid; }
+
+    private:
+        KernelIdentity& owner_;
+        const ucred credentials_;
+    };
 };
 
+/// A directory for a socket, which has a path of so many bytes there.
+class SocketDirectory {
+public:
+    explicit SocketDirectory(std::size_t pathBytes = 50) {
+        path_.resize(pathBytes - std::strlen("/s"), 'd');
+        ::mkdir(path_.c_str(), 0755);
+        descriptor_.reset(::open(path_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    }
+    ListenerAddress address() const { return {.directory = descriptor_.get(), .directoryPath = path_, .name = "s"}; }
+    /// A path that fits an address, whatever the directory's does.
+    std::string socketPath() const { return "/proc/self/fd/" + std::to_string(descriptor_.get()) + "/s"; }
+    /// 0 when there is none.
+    mode_t modeOfSocket() const {
+        struct stat status = {};
+        return ::fstatat(descriptor_.get(), "s", &status, AT_SYMLINK_NOFOLLOW) == 0 ? status.st_mode : 0;
+    }
+
+private:
+    const support::TemporaryDirectory base_{"/tmp"};
+    std::string path_ = base_.path() + "/";
+    FileDescriptor descriptor_;
+};
+
+inline sockaddr_un addressOf(const std::string& path) {
+    sockaddr_un address{.sun_family = AF_UNIX, .sun_path = {}};
+    path.copy(address.sun_path, sizeof address.sun_path - 1);
+    return address;
+}
+
+inline bool connectTo(int socket, const std::string& path) {
+    const sockaddr_un address = addressOf(path);
+    return ::connect(socket, reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
+}
+
+/// From now on calls give up after ten seconds.
+inline void limitWaiting(int socket) {
+    const timeval timeout = {.tv_sec = 10, .tv_usec = 0};
+    ::setsockopt(socket, SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof timeout);
+    ::setsockopt(socket, SOL_SOCKET, SO_SNDTIMEO, &timeout, sizeof timeout);
+}
+
+/// As one message with a descriptor attached.
+inline bool sendWithDescriptor(int socket, const plist::Data& bytes, int descriptor) {
+    iovec part = {.iov_base = const_cast<std::uint8_t*>(bytes.data()), .iov_len = bytes.size()};
+    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
+    msghdr message = {};
+    message.msg_iov = &part;
+    message.msg_iovlen = 1;
+    message.msg_control = control;
+    message.msg_controllen = sizeof control;
+    cmsghdr* header = CMSG_FIRSTHDR(&message);
+    header->cmsg_level = SOL_SOCKET;
+    header->cmsg_type = SCM_RIGHTS;
+    header->cmsg_len = CMSG_LEN(sizeof(int));
+    std::memcpy(CMSG_DATA(header), &descriptor, sizeof descriptor);
+    return ::sendmsg(socket, &message, MSG_NOSIGNAL) == static_cast<ssize_t>(bytes.size());
+}
+
+inline void append(plist::Data& bytes, const plist::Data& more) {
+    bytes.insert(bytes.end(), more.begin(), more.end());
+}
+
+inline plist::Data partOf(const plist::Data& bytes, std::size_t begin, std::size_t end) {
+    return {bytes.data() + begin, bytes.data() + end};
+}
+
 /// One whole frame.
-plist::Data frameOf(const plist::Dictionary& message, std::uint64_t id, std::uint32_t flags = ipc::frameExpectsReply);
-plist::Data frameOf(std::uint32_t length, std::uint32_t flags, std::uint64_t id, const plist::Data& payload);
-/// A request that the echo handler answers with "Number".
-plist::Dictionary numbered(std::uint64_t number);
+inline plist::Data frameOf(std::uint32_t length, std::uint32_t flags, std::uint64_t id, const plist::Data& payload) {
+    plist::Data frame(ipc::frameHeaderBytes);
+    ipc::encodeFrameHeader({.payloadBytes = length, .flags = flags, .id = id},
+                           std::span(frame).first<ipc::frameHeaderBytes>());
+    append(frame, payload);
+    return frame;
+}
+
+inline plist::Data frameOf(const plist::Dictionary& message, std::uint64_t id,
+                           std::uint32_t flags = ipc::frameExpectsReply) {
+    const auto payload = plist::writeBinary(message);
+    return frameOf(static_cast<std::uint32_t>(payload->size()), flags, id, *payload);
+}
+
+/// A request with a number in it.
+inline plist::Dictionary numbered(std::uint64_t number) {
+    return {{"Number", number}};
+}
+
+/// As many frames as that, numbered from 0 on, which are also their ids.
+inline plist::Data burstOf(std::uint64_t count, std::uint32_t flags = ipc::frameExpectsReply) {
+    plist::Data burst;
+    for (std::uint64_t i = 0; i < count; ++i)
+        append(burst, frameOf(numbered(i), i, flags));
+    return burst;
+}
 
 struct Reply {
     std::uint64_t id = 0;
@@ -47,62 +163,166 @@ struct Reply {
 /// A client that knows nothing of what is right. Its calls give up after ten seconds.
 class RawClient {
 public:
-    explicit RawClient(const std::string& socketPath);
-
+    explicit RawClient(const std::string& socketPath) : socket_(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
+        EXPECT_TRUE(connectTo(socket_.get(), socketPath)) << errno;
+        limitWaiting(socket_.get());
+    }
     int socket() const { return socket_.get(); }
     /// False when the daemon's side has closed.
-    bool send(const plist::Data& bytes);
+    bool send(const plist::Data& bytes) {
+        return ::send(socket_.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL) == static_cast<ssize_t>(bytes.size());
+    }
     bool send(const plist::Dictionary& message, std::uint64_t id) { return send(frameOf(message, id)); }
     /// nullopt at the end of the stream, on a reset, or when nothing comes.
-    std::optional<Reply> receive();
+    std::optional<Reply> receive() {
+        std::array<std::uint8_t, ipc::frameHeaderBytes> bytes;
+        if (!receiveAll(bytes))
+            return std::nullopt;
+        const ipc::FrameHeader header = ipc::decodeFrameHeader(bytes);
+        EXPECT_TRUE(header.isValidReply());
+        plist::Data payload(header.payloadBytes);
+        if (!receiveAll(payload))
+            return std::nullopt;
+        auto value = plist::readBinary(payload);
+        if (!value || !value->asDictionary())
+            return std::nullopt;
+        return Reply{.id = header.id, .message = std::move(*value->asMutableDictionary())};
+    }
     /// The same, when something comes within a few milliseconds.
-    std::optional<Reply> receiveIfAny();
+    std::optional<Reply> receiveIfAny() {
+        pollfd descriptor = {.fd = socket_.get(), .events = POLLIN, .revents = 0};
+        return ::poll(&descriptor, 1, 5) > 0 ? receive() : std::nullopt;
+    }
+    /// Whether this is the next reply.
+    bool receives(std::uint64_t id, const plist::Dictionary& message) {
+        const std::optional<Reply> reply = receive();
+        return reply && reply->id == id && reply->message == message;
+    }
     /// Waits for the end of the stream or a reset; false when anything else comes, or nothing.
-    bool ended();
+    bool ended() {
+        std::uint8_t byte = 0;
+        const ssize_t received = ::recv(socket_.get(), &byte, 1, 0);
+        return received == 0 || (received < 0 && errno == ECONNRESET);
+    }
     /// A request that comes back, so the listener is alive for this client.
-    bool isServed();
+    bool isServed() { return send(numbered(77), 4711) && receives(4711, numbered(77)); }
     void close() { socket_.reset(); }
 
 private:
-    bool receiveExactly(std::uint8_t* bytes, std::size_t count);
+    bool receiveAll(std::span<std::uint8_t> bytes) {
+        return ::recv(socket_.get(), bytes.data(), bytes.size(), MSG_WAITALL) == static_cast<ssize_t>(bytes.size());
+    }
+
     FileDescriptor socket_;
 };
 
-/// Counts the events that a handler gets.
-struct EventCounts {
-    std::atomic<int> messages{0};
-    std::atomic<int> others{0};
-    std::atomic<int> invalids{0};
+/// The ways to answer that a handler keeps for later. Any thread.
+class KeptReplies {
+public:
+    void keep(const ServiceEvent& event) {
+        const std::lock_guard lock(mutex_);
+        kept_.push_back(event.reply);
+    }
+    /// Waits for so many and takes them.
+    std::vector<std::shared_ptr<ReplyChannel>> take(std::size_t count) {
+        EXPECT_TRUE(eventually([&] {
+            const std::lock_guard lock(mutex_);
+            return kept_.size() >= count;
+        }));
+        const std::lock_guard lock(mutex_);
+        return std::exchange(kept_, {});
+    }
+
+private:
+    std::mutex mutex_;
+    std::vector<std::shared_ptr<ReplyChannel>> kept_;
 };
 
 class ListenerWorld {
 public:
     using MessageHandler = std::function<void(PeerConnection&, ServiceEvent&)>;
 
-    ListenerWorld();
-    ~ListenerWorld();
+    ~ListenerWorld() { stop(); }
 
     /// Starts; `onMessage` gets the messages (the request comes back when it is empty), `counts` all events. That a
     /// connection has one event at a time is checked for every one.
-    void start(MessageHandler onMessage = {});
-    void stop();
+    void start(MessageHandler onMessage = {}) {
+        onMessage_ = std::move(onMessage);
+        ListenerOptions options;
+        options.address = directory_.address();
+        options.limits = limits;
+        options.report = [this](std::string_view line) {
+            const std::lock_guard lock(mutex_);
+            reports_.emplace_back(line);
+        };
+        listener_ = std::make_unique<LinuxServiceListener>(identity, std::move(options));
+        EXPECT_TRUE(listener_->resume([this](PeerConnection& connection, ServiceEvent& event) {
+            {
+                const std::lock_guard lock(mutex_);
+                EXPECT_TRUE(inHandler_.insert(&connection).second) << "two events of one connection at once";
+            }
+            handle(connection, event);
+            const std::lock_guard lock(mutex_);
+            inHandler_.erase(&connection);
+        })) << errno;
+    }
+    void stop() {
+        if (listener_)
+            listener_->stop();
+    }
     /// Where everything was given back: no connection, no byte, no peer. Waits up to ten seconds for it.
-    bool isAtRest();
-
-    const std::string& socketPath() const { return socketPath_; }
-    LinuxServiceListener& listener() { return *listener_; }
-    std::vector<std::string> reports();
+    bool isAtRest() {
+        return eventually([this] {
+            const ListenerCounters now = counters();
+            return now.connections == 0 && now.inputBytes == 0 && now.outputBytes == 0 && identity.peers == 0;
+        });
+    }
+    std::string socketPath() const { return directory_.socketPath(); }
+    RawClient connect() const { return RawClient(socketPath()); }
+    std::vector<RawClient> connect(std::size_t count) const {
+        std::vector<RawClient> clients;
+        while (clients.size() < count)
+            clients.push_back(connect());
+        return clients;
+    }
+    ListenerCounters counters() const { return listener_->counters(); }
+    std::vector<std::string> reports() {
+        const std::lock_guard lock(mutex_);
+        return reports_;
+    }
+    /// Waits until a report has these words.
+    bool reports(std::string_view words) {
+        return eventually([&] {
+            return std::ranges::any_of(reports(), [&](const std::string& line) { return line.contains(words); });
+        });
+    }
 
     ListenerLimits limits;
     KernelIdentity identity;
-    EventCounts counts;
+    /// The events that the handler got.
+    struct {
+        std::atomic<int> messages{0};
+        std::atomic<int> others{0};
+        std::atomic<int> invalids{0};
+    } counts;
 
 private:
-    void handle(PeerConnection& connection, ServiceEvent& event);
+    void handle(PeerConnection& connection, ServiceEvent& event) {
+        if (event.kind == ServiceEvent::Kind::invalid) {
+            ++counts.invalids;
+        } else if (event.kind == ServiceEvent::Kind::other) {
+            ++counts.others;
+            EXPECT_EQ(event.reply, nullptr);
+        } else {
+            ++counts.messages;
+            if (onMessage_)
+                onMessage_(connection, event);
+            else if (event.reply)
+                event.reply->send(event.request);
+        }
+    }
 
-    std::string directory_;
-    FileDescriptor directoryDescriptor_;
-    std::string socketPath_;
+    const SocketDirectory directory_;
     MessageHandler onMessage_;
     std::mutex mutex_;
     std::set<const PeerConnection*> inHandler_;
@@ -110,7 +330,4 @@ private:
     std::unique_ptr<LinuxServiceListener> listener_;
 };
 
-/// Waits up to ten seconds.
-bool eventually(const std::function<bool()>& condition);
-
-} // namespace zor::platform::test
+} // namespace zor::platform

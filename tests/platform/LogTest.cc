@@ -7,25 +7,40 @@
 
 #include <csignal>
 #include <map>
-#include <poll.h>
 #include <sys/resource.h>
-#include <vector>
 
 namespace zor::platform {
 namespace {
 
 std::vector<std::string> linesOf(const std::string& text) {
+    EXPECT_TRUE(text.empty() || text.ends_with('\n')) << "the last line has no end";
     std::vector<std::string> lines;
-    std::size_t begin = 0;
-    for (std::size_t end = text.find('\n'); end != std::string::npos; end = text.find('\n', begin)) {
-        lines.push_back(text.substr(begin, end - begin));
-        begin = end + 1;
-    }
-    EXPECT_EQ(begin, text.size()) << "the last line has no end";
+    std::istringstream stream(text);
+    for (std::string line; std::getline(stream, line);)
+        lines.push_back(line);
     return lines;
 }
 
-// Goal: no string that a client gives can forge a line or steer a terminal. Method: one row for each kind of byte.
+/// Writes into "log", "log.1" and so on in a root of its own.
+struct FileLog {
+    using Foreground = RotatingLog::Foreground;
+    FileLog(unsigned fileCount, std::size_t bytesMax, Foreground foreground = Foreground::no, int standardError = 2)
+        : log(foreground, standardError) {
+        EXPECT_TRUE(log.open("com.veltra.zorvaned", 5));
+        log.enableDiskLogging(root.path("log"), fileCount, bytesMax);
+    }
+    void write(const std::string& message, int level = 3) { log.write(level, "f", message); }
+    /// Of one of the files.
+    [[nodiscard]] std::string text(unsigned index = 0) const {
+        return root.read(index == 0 ? "log" : "log." + std::to_string(index));
+    }
+    [[nodiscard]] std::vector<std::string> lines(unsigned index = 0) const { return linesOf(text(index)); }
+
+    const TestRoot root;
+    RotatingLog log;
+};
+
+// No string that a client gives can forge a line or steer a terminal.
 TEST(LogLine, EscapesWhatIsNoText) {
     const std::vector<std::pair<std::string, std::string>> cases = {
         {"plain text\twith a tab", "plain text\twith a tab"},
@@ -48,23 +63,15 @@ TEST(LogLine, EscapesWhatIsNoText) {
     }
 }
 
-TEST(LogLine, HasTheFormThatToolsRead) {
-    const LogEvent event{.time = {.tv_sec = 1795515330, .tv_nsec = 123'999'999},
-                         .pid = 42,
-                         .level = 5,
-                         .function = "main",
-                         .message = "hello"};
-    EXPECT_EQ(formatLogLine(event, 1000), "2026-11-24T10:15:30.123+00:00 zorvaned[42]: <5> main: hello\n");
-}
-
-// Goal: a line never passes its bound, and is whole below it. Method: every bound around the length, with a message
-// whose characters take three bytes.
+// A line has the form that tools read, never passes its bound, is whole below it, and cuts no character in two.
 TEST(LogLine, IsCutAtItsBound) {
     std::string message;
     for (int i = 0; i < 20; ++i)
         message += "\xe2\x82\xac";
-    const LogEvent event{.time = {}, .pid = 1, .level = 3, .function = "f", .message = message};
+    const timespec time{.tv_sec = 1795515330, .tv_nsec = 123'999'999};
+    const LogEvent event{.time = time, .pid = 42, .level = 5, .function = "main", .message = message};
     const std::string whole = formatLogLine(event, 1000);
+    EXPECT_EQ(whole, "2026-11-24T10:15:30.123+00:00 zorvaned[42]: <5> main: " + message + "\n");
     for (std::size_t bound = 8; bound <= whole.size() + 2; ++bound) {
         const std::string line = formatLogLine(event, bound);
         EXPECT_LE(line.size(), bound);
@@ -80,131 +87,105 @@ TEST(LogLine, IsCutAtItsBound) {
     }
 }
 
-// Goal: files stay within count and size, and lines stay whole and in order. Method: many lines into several
-// configurations; the files together, oldest first, end with the newest lines without a gap.
+// Files stay within count and size, and together, oldest first, end with the newest lines without a gap.
 TEST(RotatingLog, KeepsCountAndSize) {
     for (const unsigned fileCount : {1U, 2U, 4U}) {
-        const TestRoot root;
-        RotatingLog log(RotatingLog::Foreground::no);
         constexpr std::size_t bytesMax = 1000;
-        ASSERT_TRUE(log.open("com.veltra.zorvaned", 5));
-        log.enableDiskLogging(root.path("log"), fileCount, bytesMax);
+        FileLog log(fileCount, bytesMax);
         constexpr int linesWritten = 200;
         for (int i = 0; i < linesWritten; ++i)
-            log.write(3, "test", "line " + std::to_string(i));
+            log.write("line " + std::to_string(i));
         std::vector<std::string> lines;
         for (unsigned index = fileCount; index-- > 0;) {
-            const std::string text = root.read(index == 0 ? "log" : "log." + std::to_string(index));
-            EXPECT_LE(text.size(), bytesMax);
-            EXPECT_FALSE(text.empty());
-            for (std::string& line : linesOf(text))
-                lines.push_back(std::move(line));
+            const std::vector<std::string> ofFile = log.lines(index);
+            EXPECT_FALSE(ofFile.empty());
+            EXPECT_LE(log.text(index).size(), bytesMax);
+            lines.insert(lines.end(), ofFile.begin(), ofFile.end());
         }
-        EXPECT_NE(::access(root.path("log." + std::to_string(fileCount)).c_str(), F_OK), 0);
+        EXPECT_EQ(log.text(fileCount), "");
         EXPECT_GT(lines.size(), (fileCount - 1) * 10);
         for (std::size_t i = 0; i < lines.size(); ++i)
             EXPECT_TRUE(lines[i].ends_with("line " + std::to_string(linesWritten - lines.size() + i))) << lines[i];
-        EXPECT_EQ(log.linesLost(), 0U);
+        EXPECT_EQ(log.log.linesLost(), 0U);
     }
 }
 
-// Goal: a log that exists is gone on with, and a link in its place is not followed.
+// A log that exists is gone on with, and a link in its place is not followed.
 TEST(RotatingLog, OpensOnlyAFileOfItsOwn) {
-    const TestRoot root;
-    root.write("log", "old line\n");
-    root.write("victim", "untouched");
-    RotatingLog log(RotatingLog::Foreground::no);
-    ASSERT_TRUE(log.open("n", 5));
-    log.enableDiskLogging(root.path("log"), 1, 1000);
-    log.write(3, "f", "new");
-    EXPECT_EQ(linesOf(root.read("log")).size(), 2U);
-    EXPECT_EQ(linesOf(root.read("log")).front(), "old line");
-    ASSERT_EQ(::symlink(root.path("victim").c_str(), root.path("linked").c_str()), 0);
-    log.enableDiskLogging(root.path("linked"), 1, 1000);
-    log.write(3, "f", "lost");
-    EXPECT_EQ(root.read("victim"), "untouched");
-    EXPECT_EQ(log.linesLost(), 1U);
+    FileLog log(1, 1000);
+    log.write("old line");
+    log.root.write("victim", "untouched");
+    ASSERT_EQ(::symlink(log.root.path("victim").c_str(), log.root.path("linked").c_str()), 0);
+    log.log.enableDiskLogging(log.root.path("linked"), 1, 1000);
+    log.write("lost");
+    EXPECT_EQ(log.root.read("victim"), "untouched");
+    EXPECT_EQ(log.log.linesLost(), 1U);
+    log.log.enableDiskLogging(log.root.path("log"), 1, 1000);
+    log.write("new");
+    ASSERT_EQ(log.lines().size(), 3U);
+    EXPECT_TRUE(log.lines().front().ends_with("old line"));
 }
 
-// Goal: a full disk costs lines, not the daemon, and leaves no half line. Method: the process's own file-size limit
-// stands for the full disk, at every size within one line.
+// A full disk (the process's own limit, at every size within one line) costs lines, not the daemon, and leaves no half.
 TEST(RotatingLog, SurvivesAFullDisk) {
     const auto ignored = std::signal(SIGXFSZ, SIG_IGN);
     rlimit old{};
     ASSERT_EQ(::getrlimit(RLIMIT_FSIZE, &old), 0);
     for (rlim_t room = 0; room < 80; room += 7) {
-        const TestRoot root;
-        RotatingLog log(RotatingLog::Foreground::no);
-        ASSERT_TRUE(log.open("n", 5));
-        log.enableDiskLogging(root.path("log"), 2, 100'000);
-        log.write(3, "f", "before");
-        const rlimit full{.rlim_cur = root.read("log").size() + room, .rlim_max = old.rlim_max};
+        FileLog log(2, 100'000);
+        log.write("before");
+        const rlimit full{.rlim_cur = log.text().size() + room, .rlim_max = old.rlim_max};
         ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &full), 0);
-        const std::string message(100, 'x');
-        log.write(3, "f", message);
-        log.write(3, "f", message);
+        log.write(std::string(100, 'x'));
+        log.write(std::string(100, 'x'));
         ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &old), 0);
-        log.write(3, "f", "after");
-        const auto lines = linesOf(root.read("log"));
+        log.write("after");
+        const auto lines = log.lines();
         ASSERT_EQ(lines.size(), 3U);
         EXPECT_TRUE(lines[0].ends_with("before"));
-        EXPECT_NE(lines[1].find("log: 2 log lines were lost: "), std::string::npos) << lines[1];
+        EXPECT_TRUE(lines[1].contains("log: 2 log lines were lost: ")) << lines[1];
         EXPECT_TRUE(lines[2].ends_with("after"));
-        EXPECT_EQ(log.linesLost(), 2U);
+        EXPECT_EQ(log.log.linesLost(), 2U);
     }
     std::signal(SIGXFSZ, ignored);
 }
 
-// Goal: standard error gets the whole line behind the prefix; a reader that has stopped costs lines there, not time.
+// Standard error gets the whole line behind the prefix; a reader that has stopped costs lines there, not time.
 TEST(RotatingLog, WritesToStandardErrorWithoutWaitingForever) {
-    const TestRoot root;
     int ends[2] = {};
     ASSERT_EQ(::pipe2(ends, O_CLOEXEC), 0);
     const FileDescriptor reader(ends[0]);
     const FileDescriptor writer(ends[1]);
-    RotatingLog log(RotatingLog::Foreground::yes, writer.get());
-    ASSERT_TRUE(log.open("n", 5));
-    log.enableDiskLogging(root.path("log"), 1, 10'000'000);
-    log.write(5, "f", "seen");
+    FileLog log(1, 10'000'000, RotatingLog::Foreground::yes, writer.get());
+    log.write("seen", 5);
     char buffer[512];
     const ssize_t bytes = ::read(reader.get(), buffer, sizeof buffer);
     ASSERT_GT(bytes, 0);
-    EXPECT_EQ(std::string(buffer, static_cast<std::size_t>(bytes)), "<5>" + root.read("log"));
+    EXPECT_EQ(std::string(buffer, static_cast<std::size_t>(bytes)), "<5>" + log.text());
     const auto begun = std::chrono::steady_clock::now();
     for (int i = 0; i < 3000; ++i)
-        log.write(5, "f", "nobody reads this line of the log any more");
+        log.write("nobody reads this line of the log any more", 5);
     EXPECT_LT(std::chrono::steady_clock::now() - begun, std::chrono::seconds(5));
-    EXPECT_EQ(linesOf(root.read("log")).size(), 3001U);
+    EXPECT_EQ(log.lines().size(), 3001U);
 }
 
-// Goal: lines of many threads are whole, none is lost, while files rotate. Method: count them in all files.
+// Lines of many threads are whole, and none is lost, while files rotate.
 TEST(RotatingLog, SerialisesThreads) {
-    const TestRoot root;
-    RotatingLog log(RotatingLog::Foreground::no);
-    ASSERT_TRUE(log.open("n", 5));
-    log.enableDiskLogging(root.path("log"), 4, 20'000);
-    constexpr int threadCount = 4;
-    constexpr int linesEach = 200;
-    std::vector<std::thread> threads;
-    for (int t = 0; t < threadCount; ++t)
-        threads.emplace_back([&log, t] {
-            for (int i = 0; i < linesEach; ++i)
-                log.write(3, "f", "thread " + std::to_string(t) + " line " + std::to_string(i) + ".");
-        });
-    for (std::thread& thread : threads)
-        thread.join();
+    FileLog log(4, 20'000);
+    inThreads(4, [&](unsigned thread) {
+        for (int i = 0; i < 200; ++i)
+            log.write("thread " + std::to_string(thread) + " line " + std::to_string(i) + ".");
+    });
     std::size_t lines = 0;
-    for (const char* name : {"log", "log.1", "log.2", "log.3"}) {
-        for (const std::string& line : linesOf(root.read(name))) {
-            EXPECT_TRUE(line.ends_with(".") && line.find("thread ") != std::string::npos) << line;
+    for (unsigned index = 0; index < 4; ++index)
+        for (const std::string& line : log.lines(index)) {
+            EXPECT_TRUE(line.ends_with(".") && line.contains("thread ")) << line;
             ++lines;
         }
-    }
-    EXPECT_EQ(lines, static_cast<std::size_t>(threadCount * linesEach));
+    EXPECT_EQ(lines, 800U);
 }
 
-// Goal: each user has so many lines a second, what is left out is told exactly once, and many users take no more memory
-// than the table. Method: a clock of the test's own.
+// Each user has so many lines a second, what is left out is told exactly once, and the table of users is bounded.
 TEST(RefusalLimiter, CountsWhatItLeavesOut) {
     RefusalLimiter::Clock::time_point now{};
     std::map<uid_t, std::uint64_t> reported;

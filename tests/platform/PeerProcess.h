@@ -1,15 +1,18 @@
 // SPDX-License-Identifier: Apache-2.0
-// Real processes that connect to a socket: what peer identity is judged by. A process begins as a copy of the shell
-// under a name of the test's choice, connects before that, and executes whatever path it is sent next.
+// Real processes that connect to a socket, and the registry that they are judged by.
 #pragma once
 
 #include "platform/FileDescriptor.h"
 #include "platform/TestRoot.h"
+#include "platform/linux/LinuxPeerIdentity.h"
+#include "platform/linux/Names.h"
+#include "support/RecordingLog.h"
 
 #include <csignal>
-#include <cstring>
-#include <poll.h>
+#include <filesystem>
+#include <linux/sched.h>
 #include <sys/socket.h>
+#include <sys/syscall.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -19,17 +22,13 @@ namespace zor::platform {
 /// A listening socket with an address that any user can connect to.
 class PeerServer {
 public:
-    explicit PeerServer(int type = SOCK_STREAM) : type_(type), socket_(::socket(AF_UNIX, type | SOCK_CLOEXEC, 0)) {
+    PeerServer() : socket_(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
         address_.sun_family = AF_UNIX;
         // The first byte is 0: an address without a file. The kernel picks the rest.
-        socklen_t length = sizeof(sa_family_t);
-        EXPECT_EQ(::bind(socket_.get(), reinterpret_cast<sockaddr*>(&address_), length), 0);
-        length = sizeof address_;
-        EXPECT_EQ(::getsockname(socket_.get(), reinterpret_cast<sockaddr*>(&address_), &length), 0);
-        length_ = length;
+        EXPECT_EQ(::bind(socket_.get(), reinterpret_cast<sockaddr*>(&address_), sizeof(sa_family_t)), 0);
+        EXPECT_EQ(::getsockname(socket_.get(), reinterpret_cast<sockaddr*>(&address_), &length_), 0);
         EXPECT_EQ(::listen(socket_.get(), 16), 0);
     }
-    [[nodiscard]] int type() const { return type_; }
     [[nodiscard]] FileDescriptor accept() const {
         return FileDescriptor(::accept4(socket_.get(), nullptr, nullptr, SOCK_CLOEXEC));
     }
@@ -38,40 +37,49 @@ public:
     }
 
 private:
-    int type_;
     FileDescriptor socket_;
     sockaddr_un address_{};
-    socklen_t length_ = 0;
+    socklen_t length_ = sizeof address_;
 };
 
 /// Copies a program, so that its inode is the copy's alone.
 inline void copyProgram(const std::string& from, const std::string& to) {
-    std::ifstream in(from, std::ios::binary);
-    std::ofstream(to, std::ios::binary | std::ios::trunc) << in.rdbuf();
-    ::chmod(to.c_str(), 0755);
+    std::filesystem::copy_file(from, to);
 }
 
+struct PeerStart {
+    /// As whom it runs, when the test is root.
+    uid_t uid = ::geteuid();
+    enum class Connects { andIsAccepted, yes, no } connects = Connects::andIsAccepted;
+    /// Changes its world before it connects; false ends it.
+    std::function<bool()> prepare = {};
+    /// The file that it runs in the end, as it is named here, when that is not the shell's.
+    std::string runs = {};
+    /// The number that it is to have.
+    pid_t number = 0;
+};
+
+/// A process that connects and then becomes `shell`, a copy of /bin/sh; the connection stays open in it.
 class PeerProcess {
 public:
-    /// Connects as `uid` (when the test is root), then becomes `shell`, a copy of /bin/sh. The connection stays open in
-    /// it.
-    PeerProcess(const PeerServer& server, const std::string& shell, uid_t uid = ::geteuid()) {
+    PeerProcess(const PeerServer& server, const std::string& shell, const PeerStart& start = {}) {
         int ends[2] = {};
         EXPECT_EQ(::pipe2(ends, O_CLOEXEC), 0);
-        const int connection = ::socket(AF_UNIX, server.type(), 0);
-        pid_ = ::fork();
+        const FileDescriptor connection(::socket(AF_UNIX, SOCK_STREAM, 0));
+        pid_ = start.number == 0 ? ::fork() : forkAs(start.number);
         if (pid_ == 0) {
-            const bool changed = uid == ::geteuid() || ::setresuid(uid, uid, uid) == 0;
-            if (!changed || server.connect(connection) != 0 || ::dup3(ends[0], 0, 0) != 0)
-                ::_exit(1);
-            ::execl(shell.c_str(), shell.c_str(), "-c", "read next && exec \"$next\" 1000", nullptr);
+            const bool ready = (start.uid == ::geteuid() || ::setresuid(start.uid, start.uid, start.uid) == 0) &&
+                               (!start.prepare || start.prepare()) &&
+                               (start.connects == PeerStart::Connects::no || server.connect(connection.get()) == 0);
+            if (ready && ::dup3(ends[0], 0, 0) == 0)
+                ::execl(shell.c_str(), shell.c_str(), "-c", "read next && exec \"$next\" 1000", nullptr);
             ::_exit(1);
         }
-        ::close(connection);
         ::close(ends[0]);
         commands_.reset(ends[1]);
-        accepted_ = server.accept();
-        EXPECT_TRUE(runs(shell)) << "the process did not start";
+        if (start.connects == PeerStart::Connects::andIsAccepted)
+            accepted_ = server.accept();
+        EXPECT_TRUE(pid_ < 0 || runs(start.runs.empty() ? shell : start.runs)) << "the process did not start";
     }
     ~PeerProcess() { end(); }
     PeerProcess(const PeerProcess&) = delete;
@@ -98,17 +106,68 @@ public:
 private:
     [[nodiscard]] bool runs(const std::string& program) const {
         const std::string link = "/proc/" + std::to_string(pid_) + "/exe";
-        return eventually([&] {
-            struct stat wanted{};
-            struct stat actual{};
-            return ::stat(program.c_str(), &wanted) == 0 && ::stat(link.c_str(), &actual) == 0 &&
-                   wanted.st_ino == actual.st_ino && wanted.st_dev == actual.st_dev;
-        });
+        std::error_code ignored;
+        return eventually([&] { return std::filesystem::equivalent(program, link, ignored); });
+    }
+    static pid_t forkAs(pid_t number) {
+        clone_args arguments{};
+        arguments.exit_signal = SIGCHLD;
+        arguments.set_tid = reinterpret_cast<std::uintptr_t>(&number);
+        arguments.set_tid_size = 1;
+        return static_cast<pid_t>(::syscall(SYS_clone3, &arguments, sizeof arguments));
     }
 
     pid_t pid_ = -1;
     FileDescriptor commands_;
     FileDescriptor accepted_;
 };
+
+/// Whom a peer's own uid counts as: the owner of the root, or some user.
+enum class PeerIs { owner, user };
+
+/// A root with a registry and some programs, "agent", "other" and "sleeper".
+struct PeerWorld {
+    explicit PeerWorld(PeerIs peers = PeerIs::user, uid_t peerUid = ::geteuid())
+        // A peer counts as the owner when its uid is the daemon's. uid 0 always does.
+        : identity(registry, peers == PeerIs::owner ? peerUid : peerUid + 1000) {
+        copyProgram("/bin/sh", program("agent"));
+        copyProgram("/bin/sh", program("other"));
+        copyProgram("/bin/sleep", program("sleeper"));
+    }
+    [[nodiscard]] std::string program(const std::string& name) const { return test.path(name); }
+    [[nodiscard]] std::string entry(const std::string& name, const std::string& more = "") const {
+        return "<plist version=\"1.0\"><dict><key>Executable</key><string>" + program(name) + "</string>" + more +
+               "</dict></plist>";
+    }
+    /// As an entry that gives this identifier.
+    [[nodiscard]] std::string named(const std::string& name, const std::string& identifier,
+                                    const std::string& more = "") const {
+        return entry(name, "<key>Identifier</key><string>" + identifier + "</string>" + more);
+    }
+    /// Registers a program under an identifier.
+    void registerAs(const std::string& file, const std::string& name, const std::string& identifier,
+                    const std::string& more = "") const {
+        test.replace(pathOf(file), named(name, identifier, more));
+    }
+    /// Of a registry file, from the root.
+    [[nodiscard]] static std::string pathOf(const std::string& file) {
+        return std::string(names::identityDirectory) + "/" + file;
+    }
+    [[nodiscard]] std::unique_ptr<Peer> peerOf(const PeerProcess& process) {
+        return identity.peerOfSocket(process.socket());
+    }
+
+    TestRoot test;
+    support::RecordingLog log{7};
+    IdentityRegistry registry{test.root(), log, ::geteuid()};
+    LinuxPeerIdentity identity;
+    PeerServer server;
+};
+
+/// What the peer is now: its identifier, "" for a grant without one, "-" for no grant.
+inline std::string who(Peer& peer) {
+    const Identity identity = peer.identify(Peer::Explain::no);
+    return !identity.grant ? "-" : identity.grant->identifier.value_or("");
+}
 
 } // namespace zor::platform

@@ -16,25 +16,20 @@
 namespace zor::platform {
 namespace {
 
-// Goal: jobs run one at a time, in order, whoever queues them. Method: threads that queue; each job looks for another
-// one inside.
+// Jobs run one at a time, in order, whichever thread queues them.
 TEST(SerialWorkQueue, RunsOneAtATimeInOrder) {
     std::atomic<int> inside{0};
     std::vector<std::vector<int>> seen(4);
     {
         SerialWorkQueue queue("com.veltra.test");
-        std::vector<std::thread> threads;
-        for (int t = 0; t < 4; ++t)
-            threads.emplace_back([&, t] {
-                for (int i = 0; i < 500; ++i)
-                    queue.async([&, t, i] {
-                        EXPECT_EQ(inside.fetch_add(1), 0);
-                        seen[static_cast<std::size_t>(t)].push_back(i);
-                        inside.fetch_sub(1);
-                    });
-            });
-        for (std::thread& thread : threads)
-            thread.join();
+        inThreads(4, [&](unsigned thread) {
+            for (int i = 0; i < 500; ++i)
+                queue.async([&, thread, i] {
+                    EXPECT_EQ(inside.fetch_add(1), 0);
+                    seen[thread].push_back(i);
+                    inside.fetch_sub(1);
+                });
+        });
     }
     for (const auto& ofThread : seen) {
         ASSERT_EQ(ofThread.size(), 500U);
@@ -42,8 +37,8 @@ TEST(SerialWorkQueue, RunsOneAtATimeInOrder) {
     }
 }
 
-// Goal: no job begins after suspend has returned, and all that wait run after resume. Method: again and again under
-// load; of the five that are queued, the one that was just running may still end.
+// No job begins after suspend has returned (the one that was running may still end), and all that wait run after
+// resume.
 TEST(SerialWorkQueue, BeginsNothingWhileSuspended) {
     std::atomic<int> ran{0};
     SerialWorkQueue queue("com.veltra.test");
@@ -63,8 +58,7 @@ TEST(SerialWorkQueue, BeginsNothingWhileSuspended) {
     }
 }
 
-// Goal: what happens to queued jobs when the queue goes. Method: one that runs them, with jobs that queue more; one
-// that is suspended drops them; in both cases nothing that a job holds is left.
+// When the queue goes, jobs run, also those that jobs queue, or are dropped when it is suspended; no job is leaked.
 TEST(SerialWorkQueue, FinishesOrDropsWhatIsQueued) {
     const auto held = std::make_shared<int>(0);
     std::atomic<int> ran{0};
@@ -87,7 +81,7 @@ TEST(SerialWorkQueue, FinishesOrDropsWhatIsQueued) {
     EXPECT_EQ(held.use_count(), 1);
 }
 
-// Goal: the background queue stands behind everything else, and its thread can be told from others.
+// The background queue stands behind everything else, and its thread can be told from others.
 TEST(SerialWorkQueue, BackgroundIsIdle) {
     int policy = -1;
     long ioPriority = -1;
@@ -105,8 +99,8 @@ TEST(SerialWorkQueue, BackgroundIsIdle) {
     EXPECT_STREQ(name, "deathrow");
 }
 
-// Goal: callbacks and posted jobs run on the loop's thread; a callback that unwatches another one whose event is
-// already fetched prevents it; a descriptor number that is used again is not mistaken for the old one.
+// A callback that unwatches another one whose event is already fetched prevents it; a descriptor number that is used
+// again is not mistaken for the old one.
 TEST(EpollRunLoop, CallsOnlyWhatIsStillWatched) {
     EpollRunLoop loop;
     FileDescriptor first(::eventfd(1, EFD_CLOEXEC | EFD_NONBLOCK));
@@ -130,14 +124,13 @@ TEST(EpollRunLoop, CallsOnlyWhatIsStillWatched) {
     EXPECT_FALSE(loop.watch(-1, [] {}));
 }
 
-// Goal: posting and stopping from other threads loses nothing. Method: threads that post; the last job stops.
+// Posting and stopping from other threads loses nothing.
 TEST(EpollRunLoop, TakesJobsFromAnyThread) {
     EpollRunLoop loop;
     const auto loopThread = std::this_thread::get_id();
     int ran = 0;
-    std::vector<std::thread> threads;
-    for (int t = 0; t < 4; ++t)
-        threads.emplace_back([&] {
+    std::thread posting([&] {
+        inThreads(4, [&](unsigned) {
             for (int i = 0; i < 500; ++i)
                 loop.post([&] {
                     EXPECT_EQ(std::this_thread::get_id(), loopThread);
@@ -145,9 +138,9 @@ TEST(EpollRunLoop, TakesJobsFromAnyThread) {
                         loop.stop();
                 });
         });
+    });
     loop.run();
-    for (std::thread& thread : threads)
-        thread.join();
+    posting.join();
     EXPECT_EQ(ran, 2000);
     loop.stop();
     loop.run();

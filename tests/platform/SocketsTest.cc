@@ -1,18 +1,20 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "platform/PeerProcess.h"
+#include "platform/ListenerWorld.h"
 #include "platform/linux/EpollRunLoop.h"
 #include "platform/linux/Names.h"
 #include "platform/linux/NotifySocket.h"
 #include "platform/linux/PassedSockets.h"
 #include "platform/linux/SeqpacketUpcallPort.h"
+#include "support/ProcessResources.h"
 
 #include <algorithm>
-#include <atomic>
+#include <sys/socket.h>
+#include <sys/wait.h>
 
 namespace zor::platform {
 namespace {
 
-// Goal: sockets are taken only when they are meant for this process, by name, and none is inherited or left open.
+// Sockets are taken only when they are meant for this process, by name, and none is inherited or left open.
 TEST(PassedSockets, AreTakenByName) {
     const std::string self = std::to_string(::getpid());
     constexpr int first = 200;
@@ -20,7 +22,6 @@ TEST(PassedSockets, AreTakenByName) {
         for (int i = 0; i < count; ++i)
             ASSERT_EQ(::fcntl(0, F_DUPFD, first + i), first + i);
     };
-    const auto isOpen = [](int fd) { return ::fcntl(fd, F_GETFD) >= 0; };
     pass(3);
     {
         auto passed = PassedSockets::of({.pid = self, .count = "3", .names = "upcall:other:ipsi"}, first);
@@ -32,8 +33,8 @@ TEST(PassedSockets, AreTakenByName) {
         EXPECT_FALSE(passed.take("absent").valid());
     }
     for (int i = 0; i < 3; ++i)
-        EXPECT_FALSE(isOpen(first + i));
-    const std::vector<PassedSockets::Variables> meaningless = {
+        EXPECT_EQ(::fcntl(first + i, F_GETFD), -1);
+    const PassedSockets::Variables meaningless[] = {
         {.pid = std::to_string(::getppid()), .count = "1", .names = "ipsi"},
         {.pid = "", .count = "1", .names = "ipsi"},
         {.pid = self + "x", .count = "1", .names = "ipsi"},
@@ -44,18 +45,15 @@ TEST(PassedSockets, AreTakenByName) {
     pass(1);
     for (const auto& variables : meaningless)
         EXPECT_FALSE(PassedSockets::of(variables, first).take("ipsi").valid()) << variables.pid << variables.count;
-    EXPECT_TRUE(isOpen(first)) << "what is another's is left alone";
-    ::close(first);
+    EXPECT_EQ(::close(first), 0) << "what is another's is left alone";
     EXPECT_FALSE(PassedSockets::of({.pid = self, .count = "1", .names = "ipsi"}, first).take("ipsi").valid());
 }
 
 TEST(NotifySocket, SendsOneDatagram) {
     const TestRoot test;
     const FileDescriptor socket(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
     const std::string path = test.path("notify");
-    std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
+    const sockaddr_un address = addressOf(path);
     ASSERT_EQ(::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
     EXPECT_EQ(NotifySocket(path).send("READY=1"), 0);
     char buffer[64];
@@ -66,43 +64,10 @@ TEST(NotifySocket, SendsOneDatagram) {
     EXPECT_EQ(NotifySocket("/" + std::string(200, 'x')).send("READY=1"), EINVAL);
 }
 
-/// Grants to every peer what the test says.
-class FixedIdentity final : public PeerIdentity {
-public:
-    std::atomic<bool> kernelAgent{false};
-
-    [[nodiscard]] std::unique_ptr<Peer> peerOfSocket(int socket) override {
-        ucred credentials{};
-        socklen_t length = sizeof credentials;
-        EXPECT_EQ(::getsockopt(socket, SOL_SOCKET, SO_PEERCRED, &credentials, &length), 0);
-        return std::make_unique<FixedPeer>(*this, credentials.pid);
-    }
-    [[nodiscard]] bool ownsRoot(uid_t) const override { return false; }
-
-private:
-    class FixedPeer final : public Peer {
-    public:
-        FixedPeer(const FixedIdentity& owner, pid_t pid) : owner_(owner), pid_(pid) {}
-        [[nodiscard]] Identity identify(Explain) override {
-            return {.pid = pid_,
-                    .effectiveUserId = 0,
-                    .grant = std::make_shared<IdentityGrant>(IdentityGrant{.kernelAgent = owner_.kernelAgent}),
-                    .explanation = {}};
-        }
-        [[nodiscard]] pid_t pid() const override { return pid_; }
-        [[nodiscard]] uid_t kernelUserId() const override { return 0; }
-
-    private:
-        const FixedIdentity& owner_;
-        const pid_t pid_;
-    };
-};
-
 /// A port that is served on a thread of its own. Each reply is text: the packet's length, the sender's pid and uid.
 class ServedPort {
 public:
-    explicit ServedPort(FileDescriptor passed = {}, std::size_t longName = 0)
-        : test_(makeParent(longName)), port_(test_->root(), identity, std::move(passed)) {
+    explicit ServedPort(const std::string& parent = "/tmp") : test_(parent) {
         EXPECT_EQ(port_.checkIn(), 0) << port_.checkInCallName();
         EXPECT_TRUE(port_.serve(loop_, [this](const UpcallPacket& packet) { return answer(packet); }));
         thread_ = std::thread([this] { loop_.run(); });
@@ -111,35 +76,22 @@ public:
         loop_.stop();
         thread_.join();
     }
-    [[nodiscard]] const TestRoot& test() const { return *test_; }
+    [[nodiscard]] const TestRoot& test() const { return test_; }
     [[nodiscard]] std::size_t replyBytesMax() const { return port_.replyBytesMax(); }
     [[nodiscard]] FileDescriptor connect() const {
         FileDescriptor socket(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
-        const FileDescriptor directory(::open(test_->path("run/zorvane").c_str(), O_PATH | O_CLOEXEC));
-        const std::string path = "/proc/self/fd/" + std::to_string(directory.get()) + "/" + names::upcallSocket;
-        sockaddr_un address{};
-        address.sun_family = AF_UNIX;
-        std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
-        if (::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0)
+        const std::string directory = "/proc/self/fd/" + std::to_string(test_.root().runtimeDirectory());
+        if (!connectTo(socket.get(), directory + "/" + names::upcallSocket))
             socket.reset();
-        const timeval patience{.tv_sec = 5, .tv_usec = 0};
-        (void)::setsockopt(socket.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
+        limitWaiting(socket.get());
         return socket;
     }
 
-    FixedIdentity identity;
+    KernelIdentity identity;
     std::atomic<std::size_t> replyBytes{0};
     std::atomic<int> answered{0};
 
 private:
-    static std::unique_ptr<TestRoot> makeParent(std::size_t longName) {
-        if (longName == 0)
-            return std::make_unique<TestRoot>();
-        static const support::TemporaryDirectory parent("/tmp");
-        const std::string path = parent.path() + "/" + std::string(longName, 'l');
-        (void)::mkdir(path.c_str(), 0755);
-        return std::make_unique<TestRoot>(path);
-    }
     std::vector<std::uint8_t> answer(const UpcallPacket& packet) {
         ++answered;
         std::string text = std::to_string(packet.bytes.size()) + " " +
@@ -149,18 +101,22 @@ private:
         return {text.begin(), text.end()};
     }
 
-    std::unique_ptr<TestRoot> test_;
+    TestRoot test_;
     EpollRunLoop loop_;
-    SeqpacketUpcallPort port_;
+    SeqpacketUpcallPort port_{test_.root(), identity};
     std::thread thread_;
 };
 
-std::string ask(int socket, const std::string& packet) {
-    EXPECT_EQ(::send(socket, packet.data(), packet.size(), MSG_NOSIGNAL), static_cast<ssize_t>(packet.size()));
+std::string receive(int socket) {
     std::string reply(std::size_t{2} << 20, '\0');
     const ssize_t bytes = ::recv(socket, reply.data(), reply.size(), 0);
     reply.resize(bytes < 0 ? 0 : static_cast<std::size_t>(bytes));
     return reply;
+}
+
+std::string ask(int socket, const std::string& packet) {
+    EXPECT_EQ(::send(socket, packet.data(), packet.size(), MSG_NOSIGNAL), static_cast<ssize_t>(packet.size()));
+    return receive(socket);
 }
 
 TEST(UpcallPort, TellsTheSenderAsTheKernelVouches) {
@@ -170,24 +126,22 @@ TEST(UpcallPort, TellsTheSenderAsTheKernelVouches) {
     EXPECT_EQ(status.st_mode & ALLPERMS, 0600U);
     const FileDescriptor socket = port.connect();
     ASSERT_TRUE(socket.valid());
-    const std::string ids = std::to_string(::getpid()) + " " + std::to_string(::geteuid());
-    EXPECT_EQ(ask(socket.get(), std::string(52, 'x')), "52 " + ids);
+    const std::string uid = " " + std::to_string(::geteuid());
+    EXPECT_EQ(ask(socket.get(), std::string(52, 'x')), "52 " + std::to_string(::getpid()) + uid);
     port.identity.kernelAgent = true;
-    EXPECT_EQ(ask(socket.get(), "x"), "1 0 " + std::to_string(::geteuid()));
+    EXPECT_EQ(ask(socket.get(), "x"), "1 0" + uid);
     // The agent's socket in another process: that one keeps its pid.
     const pid_t child = ::fork();
     if (child == 0) {
         (void)!::send(socket.get(), "child", 5, MSG_NOSIGNAL);
         ::_exit(0);
     }
-    char reply[64] = {};
-    ASSERT_GT(::recv(socket.get(), reply, sizeof reply - 1, 0), 0);
-    EXPECT_EQ(std::string(reply), "5 " + std::to_string(child) + " " + std::to_string(::geteuid()));
+    EXPECT_EQ(receive(socket.get()), "5 " + std::to_string(child) + uid);
     ::waitpid(child, nullptr, 0);
 }
 
-// Goal: no packet and no peer holds up the port or costs it anything. Method: packets that are too long, empty, or
-// carry descriptors; peers that do not read, that are too many, that go.
+// Packets that are too long, empty or carry descriptors, peers that do not read, are too many or go, cost the port
+// nothing.
 TEST(UpcallPort, SurvivesHostilePeers) {
     ServedPort port;
     const FileDescriptor socket = port.connect();
@@ -197,33 +151,12 @@ TEST(UpcallPort, SurvivesHostilePeers) {
     EXPECT_TRUE(ask(socket.get(), std::string(SeqpacketUpcallPort::packetBytesMax, 'x')).starts_with("65536 "));
     EXPECT_EQ(port.answered, 1);
 
-    const auto openDescriptors = [] {
-        int count = 0;
-        for (int fd = 0; fd < 256; ++fd)
-            count += ::fcntl(fd, F_GETFD) >= 0 ? 1 : 0;
-        return count;
-    };
-    const int before = openDescriptors();
+    const support::ProcessResources before;
     for (int i = 0; i < 8; ++i) {
-        alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-        char byte = 'f';
-        iovec part{.iov_base = &byte, .iov_len = 1};
-        msghdr message{};
-        message.msg_iov = &part;
-        message.msg_iovlen = 1;
-        message.msg_control = control;
-        message.msg_controllen = sizeof control;
-        cmsghdr* const header = CMSG_FIRSTHDR(&message);
-        header->cmsg_level = SOL_SOCKET;
-        header->cmsg_type = SCM_RIGHTS;
-        header->cmsg_len = CMSG_LEN(sizeof(int));
-        const int given = 0;
-        std::memcpy(CMSG_DATA(header), &given, sizeof given);
-        ASSERT_EQ(::sendmsg(socket.get(), &message, 0), 1);
-        char reply[64];
-        ASSERT_GT(::recv(socket.get(), reply, sizeof reply, 0), 0);
+        ASSERT_TRUE(sendWithDescriptor(socket.get(), {'f'}, 0));
+        EXPECT_TRUE(receive(socket.get()).starts_with("1 "));
     }
-    EXPECT_EQ(openDescriptors(), before);
+    EXPECT_EQ(before.leakedSince(), "");
 
     const FileDescriptor silent = port.connect();
     port.replyBytes = 10'000;
@@ -236,18 +169,16 @@ TEST(UpcallPort, SurvivesHostilePeers) {
     for (std::size_t i = 0; i < SeqpacketUpcallPort::connectionsMax + 10; ++i)
         crowd.push_back(port.connect());
     // The last ones were turned away; the others go on.
-    char byte = 0;
-    EXPECT_LE(::recv(crowd.back().get(), &byte, 1, 0), 0);
+    EXPECT_EQ(receive(crowd.back().get()), "");
     EXPECT_TRUE(ask(socket.get(), "alive").starts_with("5 "));
     crowd.clear();
     EXPECT_TRUE(eventually([&] {
         const FileDescriptor back = port.connect();
-        char reply[64];
-        return ::send(back.get(), "back", 4, MSG_NOSIGNAL) == 4 && ::recv(back.get(), reply, sizeof reply, 0) > 0;
+        return ::send(back.get(), "back", 4, MSG_NOSIGNAL) == 4 && !receive(back.get()).empty();
     }));
 }
 
-// Goal: the longest reply that the port promises arrives whole; one that is longer is dropped and the port lives on.
+// The longest reply that the port promises arrives whole; one that is longer is dropped and the port lives on.
 TEST(UpcallPort, SendsWhatItPromises) {
     ServedPort port;
     EXPECT_GE(port.replyBytesMax(), std::size_t{64} * 1024);
@@ -262,21 +193,19 @@ TEST(UpcallPort, SendsWhatItPromises) {
     EXPECT_TRUE(ask(socket.get(), "xy").starts_with("2 "));
 }
 
-// Goal: a path that no socket address holds works, a stale socket is replaced, and a passed socket is used as it is.
+// A path that no socket address holds works, a stale socket is replaced, and a passed one must be of the right type.
 TEST(UpcallPort, BindsWhereverTheRootLies) {
-    const ServedPort deep({}, 120);
+    const support::TemporaryDirectory base("/tmp");
+    const std::string parent = base.path() + "/" + std::string(120, 'l');
+    ASSERT_EQ(::mkdir(parent.c_str(), 0755), 0);
+    const ServedPort deep(parent);
     EXPECT_TRUE(ask(deep.connect().get(), "x").starts_with("1 "));
-    {
-        const TestRoot test;
-        FixedIdentity identity;
-        SeqpacketUpcallPort first(test.root(), identity);
-        SeqpacketUpcallPort second(test.root(), identity);
-        EXPECT_EQ(first.checkIn(), 0);
-        EXPECT_EQ(second.checkIn(), 0) << "the socket of a daemon that was killed is in nobody's way";
-    }
-    PeerServer stream(SOCK_STREAM);
-    FixedIdentity identity;
     const TestRoot test;
+    KernelIdentity identity;
+    SeqpacketUpcallPort first(test.root(), identity);
+    SeqpacketUpcallPort second(test.root(), identity);
+    EXPECT_EQ(first.checkIn(), 0);
+    EXPECT_EQ(second.checkIn(), 0) << "the socket of a daemon that was killed is in nobody's way";
     SeqpacketUpcallPort wrongType(test.root(), identity, FileDescriptor(::socket(AF_UNIX, SOCK_STREAM, 0)));
     EXPECT_EQ(wrongType.checkIn(), EINVAL);
     EXPECT_STREQ(wrongType.checkInCallName(), "LISTEN_FDS");

@@ -16,6 +16,7 @@
 #include <string_view>
 #include <sys/stat.h>
 #include <thread>
+#include <vector>
 
 namespace zor::platform {
 
@@ -29,6 +30,13 @@ inline bool eventually(const std::function<bool()>& condition,
         std::this_thread::sleep_for(std::chrono::milliseconds(1));
     }
     return true;
+}
+
+/// Does the job in so many threads at once, each of which gets its number, and waits for them.
+inline void inThreads(unsigned count, const std::function<void(unsigned)>& job) {
+    std::vector<std::jthread> threads;
+    for (unsigned i = 0; i < count; ++i)
+        threads.emplace_back(job, i);
 }
 
 class TestRoot {

@@ -8,11 +8,9 @@
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
-#include <fcntl.h>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
-#include <sys/wait.h>
 #include <thread>
 #include <unistd.h>
 
@@ -20,145 +18,103 @@ namespace zor::whole {
 
 namespace {
 
-void writeFile(const std::string& path, const std::string& text) {
-    std::filesystem::create_directories(std::filesystem::path(path).parent_path());
-    std::ofstream(path) << text;
-    ::chmod(path.c_str(), 0644);
-}
-
-std::string ownProgram() {
-    char path[4096];
-    const ssize_t length = ::readlink("/proc/self/exe", path, sizeof path);
-    return {path, static_cast<std::size_t>(std::max<ssize_t>(length, 0))};
-}
-
-std::string registryEntry(const std::string& executable) {
-    return "<?xml version=\"1.0\"?><plist version=\"1.0\"><dict><key>Identifier</key><string>org.example.tests</string>"
-           "<key>Executable</key><string>" +
-           executable +
-           "</string><key>Entitlements</key><dict><key>com.veltra.private.Zorvane.allowed</key><true/></dict></dict>"
-           "</plist>";
-}
-
-std::string readAll(int descriptor) {
-    std::string text;
-    char buffer[4096];
-    for (ssize_t count; (count = ::read(descriptor, buffer, sizeof buffer)) > 0;)
-        text.append(buffer, static_cast<std::size_t>(count));
-    return text;
-}
-
-int exitStatusOf(pid_t pid) {
-    int status = 0;
-    ::waitpid(pid, &status, 0);
-    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-}
-
-pid_t execute(const std::vector<std::string>& arguments, int output) {
-    std::vector<char*> pointers;
-    for (const std::string& argument : arguments)
-        pointers.push_back(const_cast<char*>(argument.c_str()));
-    pointers.push_back(nullptr);
-    const pid_t pid = ::fork();
-    if (pid == 0) {
-        ::dup2(output, 1);
-        ::dup2(output, 2);
-        ::execv(pointers[0], pointers.data());
-        ::_exit(127);
-    }
-    return pid;
-}
+constexpr const char* everyPower =
+    "<key>Entitlements</key><dict><key>com.veltra.private.Zorvane.allowed</key><true/></dict>";
 
 } // namespace
-
-std::string programPath(const std::string& name) {
-    return ZORVANE_BINARY_DIR "/bin/" + name;
-}
 
 double raceSeconds() {
     return std::getenv("ZORVANE_TEST_LONG") ? 30.0 : 2.0;
 }
 
-DaemonProcess::Outcome runProgram(const std::vector<std::string>& arguments) {
-    int ends[2];
-    if (::pipe2(ends, O_CLOEXEC) != 0)
-        return {};
-    const pid_t pid = execute(arguments, ends[1]);
-    ::close(ends[1]);
-    DaemonProcess::Outcome outcome;
-    outcome.output = readAll(ends[0]);
-    ::close(ends[0]);
-    outcome.exitStatus = exitStatusOf(pid);
-    return outcome;
+zorvane::Client::Lookup dataContainer(const std::string& identifier, bool transient) {
+    return {.containerClass = dataApplication,
+            .user = mobile,
+            .identifier = identifier,
+            .create = true,
+            .transient = transient};
+}
+
+void writeFile(const std::string& path, const std::string& bytes, mode_t mode) {
+    std::filesystem::create_directories(std::filesystem::path(path).parent_path());
+    std::ofstream(path, std::ios::binary) << bytes;
+    ::chmod(path.c_str(), mode);
+}
+
+std::string readFile(const std::string& path) {
+    std::ostringstream text;
+    text << std::ifstream(path).rdbuf();
+    return text.str();
+}
+
+std::vector<std::string> toolWords(const std::string& root, const std::vector<std::string>& words) {
+    std::vector<std::string> all = {programPath("zorvanectl"), "--root", root};
+    all.insert(all.end(), words.begin(), words.end());
+    return all;
 }
 
 DaemonProcess::DaemonProcess(Syncs syncs, const std::string& parent) : directory_(parent), syncs_(syncs) {
     ::chmod(root().c_str(), 0755);
-    for (const char* directory : {"private/var/mobile", "private/var/second", "private/var/brevad", "tmp"})
-        std::filesystem::create_directories(path(directory));
+    std::filesystem::create_directories(path("tmp"));
     writeFile(path("etc/passwd"), "root:x:0:0::/private/var/root:/bin/sh\n"
                                   "mobile:x:501:501::/private/var/mobile:/bin/sh\n"
                                   "second:x:502:502::/private/var/second:/bin/sh\n");
-    writeFile(path("etc/zorvane/identities.d/10-tests.plist"), registryEntry(ownProgram()));
-    writeFile(path("etc/zorvane/identities.d/20-ctl.plist"), registryEntry(programPath("zorvanectl")));
-    if (::geteuid() == 0) {
-        (void)!::chown(path("private/var/mobile").c_str(), 501, 501);
-        (void)!::chown(path("private/var/second").c_str(), 502, 502);
-        (void)!::chown(path("private/var/brevad").c_str(), 33, 33);
+    for (const auto& [home, user] : {std::pair("mobile", 501U), {"second", 502U}, {"brevad", 33U}}) {
+        const std::string directory = path("private/var/") + home;
+        std::filesystem::create_directories(directory);
+        if (::geteuid() == 0)
+            (void)!::chown(directory.c_str(), user, user);
     }
+    registerProgram("10-tests", ownProgram(), everyPower);
+    registerProgram("20-ctl", programPath("zorvanectl"), everyPower);
 }
 
 DaemonProcess::~DaemonProcess() {
-    if (pid_ > 0)
-        kill();
+    daemon_.reset();
     // The marker of this root is a semaphore that would outlive it.
     if (const auto opened = platform::SystemRoot::open(root()))
         platform::SemaphoreBootMarker(*opened).forget();
 }
 
-pid_t DaemonProcess::spawn(const std::vector<std::string>& arguments, int output) const {
-    std::vector<std::string> all = {programPath("zorvaned"), "--root", root()};
-    all.insert(all.end(), arguments.begin(), arguments.end());
+void DaemonProcess::registerProgram(const std::string& fileName, const std::string& executable,
+                                    const std::string& entry) const {
+    writeFile(path("etc/zorvane/identities.d/" + fileName + ".plist"),
+              "<?xml version=\"1.0\"?><plist version=\"1.0\"><dict><key>Identifier</key><string>org.example." +
+                  fileName + "</string><key>Executable</key><string>" + executable + "</string>" + entry +
+                  "</dict></plist>");
+}
+
+void DaemonProcess::start(const std::vector<std::string>& moreArguments) {
+    std::vector<std::string> words = {programPath("zorvaned"), "--root", root()};
+    words.insert(words.end(), moreArguments.begin(), moreArguments.end());
     if (syncs_ == Syncs::off)
         ::setenv("ZORVANE_DURABILITY", "none", 1);
     else
         ::unsetenv("ZORVANE_DURABILITY");
-    return execute(all, output);
-}
-
-void DaemonProcess::start(std::vector<std::string> moreArguments) {
-    const int output = ::open(path("daemon-output").c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
-    pid_ = spawn(moreArguments, output);
-    ::close(output);
-    for (int tries = 0; tries < 3000; ++tries) {
+    daemon_.emplace(words);
+    for (int tries = 0; tries < 3000 && running(); ++tries) {
         if (zorvane::Client::connect(connection()))
             return;
-        if (!running())
-            break;
         std::this_thread::sleep_for(std::chrono::milliseconds(10));
     }
     std::fprintf(stderr, "the daemon does not serve:\n%s\n", log().c_str());
     std::abort();
 }
 
+int DaemonProcess::end(int signal) {
+    daemon_->signal(signal);
+    const int exitStatus = daemon_->wait();
+    said_ += daemon_->said();
+    daemon_.reset();
+    return exitStatus;
+}
+
 void DaemonProcess::kill() {
-    ::kill(pid_, SIGKILL);
-    (void)exitStatusOf(std::exchange(pid_, -1));
+    (void)end(SIGKILL);
 }
 
 int DaemonProcess::terminate() {
-    ::kill(pid_, SIGTERM);
-    return exitStatusOf(std::exchange(pid_, -1));
-}
-
-DaemonProcess::Outcome DaemonProcess::runAnother() const {
-    return runProgram({programPath("zorvaned"), "--root", root()});
-}
-
-bool DaemonProcess::running() const {
-    siginfo_t info{};
-    return pid_ > 0 && ::waitid(P_PID, static_cast<id_t>(pid_), &info, WEXITED | WNOHANG | WNOWAIT) == 0 &&
-           info.si_pid == 0;
+    return end(SIGTERM);
 }
 
 zorvane::Client DaemonProcess::client() const {
@@ -179,18 +135,13 @@ std::int64_t DaemonProcess::counter(const std::string& name) const {
 }
 
 std::size_t DaemonProcess::descriptors() const {
-    std::size_t count = 0;
-    for ([[maybe_unused]] const auto& entry :
-         std::filesystem::directory_iterator("/proc/" + std::to_string(pid_) + "/fd"))
-        ++count;
-    return count;
+    const std::filesystem::directory_iterator entries("/proc/" + std::to_string(pid()) + "/fd");
+    return static_cast<std::size_t>(std::distance(entries, {}));
 }
 
 std::string DaemonProcess::log() const {
-    std::ostringstream text;
-    text << std::ifstream(path("private/var/root/Library/Logs/Zorvane/zorvaned.log")).rdbuf()
-         << std::ifstream(path("daemon-output")).rdbuf();
-    return text.str();
+    return readFile(path("private/var/root/Library/Logs/Zorvane/zorvaned.log")) + said_ +
+           (daemon_ ? daemon_->said() : "");
 }
 
 } // namespace zor::whole

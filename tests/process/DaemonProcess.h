@@ -2,6 +2,7 @@
 // The real daemon as a process of its own, on a root of the test's own, for tests that look at the whole from outside.
 #pragma once
 
+#include "process/Program.h"
 #include "support/FileTree.h"
 #include "zorvane/Client.h"
 
@@ -10,6 +11,14 @@
 #include <vector>
 
 namespace zor::whole {
+
+inline constexpr std::uint64_t bundleApplication = 1;
+inline constexpr std::uint64_t dataApplication = 2;
+inline constexpr std::uint32_t mobile = 501;
+inline constexpr const char* metadataFile = ".com.veltra.zorvane.metadata.plist";
+
+/// zorvanectl on a root.
+std::vector<std::string> toolWords(const std::string& root, const std::vector<std::string>& words);
 
 /// Makes the root, with users 501 and 502 and a registry entry that gives this test program every power.
 class DaemonProcess {
@@ -21,20 +30,20 @@ public:
     DaemonProcess& operator=(const DaemonProcess&) = delete;
 
     /// Starts the daemon and waits until clients can connect.
-    void start(std::vector<std::string> moreArguments = {});
+    void start(const std::vector<std::string>& moreArguments = {});
     /// SIGKILL, and waits for the end.
     void kill();
     /// SIGTERM; the exit status.
     int terminate();
-    /// A second run of the program on the same root: its exit status and what it said.
-    struct Outcome {
-        int exitStatus = -1;
-        std::string output;
-    };
-    [[nodiscard]] Outcome runAnother() const;
+    [[nodiscard]] std::vector<std::string> toolWords(const std::vector<std::string>& words) const {
+        return whole::toolWords(root(), words);
+    }
+    [[nodiscard]] Outcome tool(const std::vector<std::string>& words) const { return runProgram(toolWords(words)); }
+    /// A program of the registry: "<key>…</key>…", beside its identifier and executable.
+    void registerProgram(const std::string& fileName, const std::string& executable, const std::string& entry) const;
 
-    [[nodiscard]] bool running() const;
-    [[nodiscard]] pid_t pid() const { return pid_; }
+    [[nodiscard]] bool running() const { return daemon_ && daemon_->running(); }
+    [[nodiscard]] pid_t pid() const { return daemon_->pid(); }
     [[nodiscard]] std::string root() const { return directory_.path(); }
     [[nodiscard]] std::string path(const std::string& relative) const { return root() + "/" + relative; }
     [[nodiscard]] zorvane::ConnectOptions connection() const { return {.root = root(), .timeoutMilliseconds = 20'000}; }
@@ -46,17 +55,20 @@ public:
     [[nodiscard]] std::string log() const;
 
 private:
-    [[nodiscard]] pid_t spawn(const std::vector<std::string>& arguments, int output) const;
+    int end(int signal);
     support::TemporaryDirectory directory_;
     const Syncs syncs_;
-    pid_t pid_ = -1;
+    std::optional<Program> daemon_;
+    /// What earlier ones said.
+    std::string said_;
 };
 
-/// Runs a program and gives its exit status and both outputs.
-DaemonProcess::Outcome runProgram(const std::vector<std::string>& arguments);
-/// Where the built programs lie.
-std::string programPath(const std::string& name);
+/// A data container of user 501's that is made where it is missing.
+zorvane::Client::Lookup dataContainer(const std::string& identifier, bool transient = false);
 /// How long a race is to last: long with ZORVANE_TEST_LONG.
 double raceSeconds();
+
+void writeFile(const std::string& path, const std::string& bytes, mode_t mode = 0644);
+std::string readFile(const std::string& path);
 
 } // namespace zor::whole

@@ -54,8 +54,7 @@ struct World {
     std::vector<Mount> mounts;
 };
 
-// Goal: a container, or a directory on the way to it, that is swapped for something else is never opened. Method: each
-// kind of container, and each thing in its place, in a tree of its own.
+// A container of any kind, or a directory on the way to it, that is swapped for something else is never opened.
 TEST(Mounts, WhatIsNoContainerIsRefused) {
     if (::geteuid() != 0)
         GTEST_SKIP() << "needs root: the containers of several users";
@@ -99,7 +98,7 @@ TEST(Mounts, WhatIsNoContainerIsRefused) {
     }
 }
 
-// Goal: a directory to read never opens a way to containers, nor hides what the sandbox has of its own.
+// A directory to read never opens a way to containers, nor hides what the sandbox has of its own.
 TEST(Mounts, DirectoriesToReadAreJudged) {
     if (::geteuid() != 0)
         GTEST_SKIP() << "needs root: the containers of several users";

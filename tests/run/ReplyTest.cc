@@ -3,7 +3,6 @@
 #include "zorvane-run/ToldContainers.h"
 
 #include <algorithm>
-#include <functional>
 #include <gtest/gtest.h>
 
 namespace zorvanerun {
@@ -70,68 +69,60 @@ std::string problemOf(const Buffer& buffer) {
     return told ? "" : told.error();
 }
 
-// Goal: a launcher that is root mounts nothing but a container in its place, whatever the answer says. Method: one lie
-// for each row, told in an answer that is otherwise good.
+// A launcher that is root mounts nothing but a container in its place, whatever the answer says: one lie for each row.
 TEST(Reply, EveryLieIsFound) {
     ASSERT_EQ(problemOf(Paths().items().buffer()), "");
+    const Paths good;
+    const std::string applications = good.home + "/Containers/Data/Application";
     struct Row {
         const char* what;
-        std::function<void(Paths&)> lie;
+        std::string Paths::* path;
+        std::string lie;
         const char* problem;
     };
     const Row rows[] = {
-        {"no success", [](Paths& p) { p.status = 0; }, "could not find or make"},
-        {"a home outside", [](Paths& p) { p.home = "/private/var/mobile"; }, "home"},
-        {"a home beside", [](Paths& p) { p.home = "/rr/private"; }, "home"},
-        {"the root as home", [](Paths& p) { p.home = "/r"; }, "home"},
-        {"a relative home", [](Paths& p) { p.home = "r/private"; }, "home"},
-        {"a way out of home", [](Paths& p) { p.home = "/r/../etc"; }, "home"},
-        {"data of the root user", [](Paths& p) { p.data = "/etc"; }, "data container"},
-        {"data of another user", [](Paths& p) { p.data = "/r/private/var/second/Containers/Data/Application/A"; },
-         "data container"},
-        {"data of another class", [](Paths& p) { p.data = "/r/private/var/mobile/Containers/Data/VPNPlugin/A"; },
-         "data container"},
-        {"all data", [](Paths& p) { p.data = "/r/private/var/mobile/Containers/Data/Application"; }, "data container"},
-        {"all data, with a slash", [](Paths& p) { p.data = "/r/private/var/mobile/Containers/Data/Application/"; },
-         "data container"},
-        {"a way up", [](Paths& p) { p.data = "/r/private/var/mobile/Containers/Data/Application/.."; }, "data"},
-        {"a hidden name", [](Paths& p) { p.data = "/r/private/var/mobile/Containers/Data/Application/.A"; }, "data"},
-        {"a place in a container",
-         [](Paths& p) { p.data = "/r/private/var/mobile/Containers/Data/Application/A/Documents"; }, "data container"},
-        {"a line of its own", [](Paths& p) { p.data = "/r/private/var/mobile/Containers/Data/Application/A\nB"; },
-         "data container"},
-        {"another's tmp", [](Paths& p) { p.temporary = "/r/private/var/mobile/Containers/Data/Application/Z/tmp"; },
-         "temporary"},
-        {"another group", [](Paths& p) { p.group = "group.b"; }, "asked for"},
-        {"a group's path elsewhere", [](Paths& p) { p.groupPath = p.data; }, "application group"},
-        {"a system container of a user", [](Paths& p) { p.system = p.data; }, "system container"},
-        {"a system group outside", [](Paths& p) { p.systemGroupPath = "/private/var/containers/Shared/SystemGroup/D"; },
+        {"a home outside", &Paths::home, "/private/var/mobile", "home"},
+        {"a home beside", &Paths::home, "/rr/private", "home"},
+        {"the root as home", &Paths::home, "/r", "home"},
+        {"a relative home", &Paths::home, "r/private", "home"},
+        {"a way out of home", &Paths::home, "/r/../etc", "home"},
+        {"data of the root user", &Paths::data, "/etc", "data container"},
+        {"data of another user", &Paths::data, "/r/private/var/second/Containers/Data/Application/A", "data container"},
+        {"data of another class", &Paths::data, good.home + "/Containers/Data/VPNPlugin/A", "data container"},
+        {"all data", &Paths::data, applications, "data container"},
+        {"all data, with a slash", &Paths::data, applications + "/", "data container"},
+        {"a way up", &Paths::data, applications + "/..", "data"},
+        {"a hidden name", &Paths::data, applications + "/.A", "data"},
+        {"a place in a container", &Paths::data, applications + "/A/Documents", "data container"},
+        {"a line of its own", &Paths::data, applications + "/A\nB", "data container"},
+        {"another's tmp", &Paths::temporary, applications + "/Z/tmp", "temporary"},
+        {"another group", &Paths::group, "group.b", "asked for"},
+        {"a group's path elsewhere", &Paths::groupPath, good.data, "application group"},
+        {"a system container of a user", &Paths::system, good.data, "system container"},
+        {"a system group outside", &Paths::systemGroupPath, "/private/var/containers/Shared/SystemGroup/D",
          "system group"},
-        {"a home in a container",
-         [](Paths& p) {
-             p.home = p.system;
-             p.data = p.home + "/Containers/Data/Application/A";
-             p.temporary = p.data + "/tmp";
-             p.groupPath = p.home + "/Containers/Shared/AppGroup/B";
-         },
-         "inside another"},
     };
     for (const Row& row : rows) {
         Paths paths;
-        row.lie(paths);
-        EXPECT_NE(problemOf(paths.items().buffer()).find(row.problem), std::string::npos)
-            << row.what << ": " << problemOf(paths.items().buffer());
+        paths.*row.path = row.lie;
+        const std::string problem = problemOf(paths.items().buffer());
+        EXPECT_TRUE(problem.contains(row.problem)) << row.what << ": " << problem;
     }
+    Paths failed;
+    failed.status = 0;
+    EXPECT_TRUE(problemOf(failed.items().buffer()).contains("could not find or make"));
+    Paths nested; // a home in a container
+    nested.home = nested.system;
+    nested.data = nested.home + "/Containers/Data/Application/A";
+    nested.temporary = nested.data + "/tmp";
+    nested.groupPath = nested.home + "/Containers/Shared/AppGroup/B";
+    EXPECT_TRUE(problemOf(nested.items().buffer()).contains("inside another"));
 }
 
-// Goal: an answer of another form is none. Method: forms that a daemon never sends, built item by item.
+// An answer of a form that a daemon never sends is none.
 TEST(Reply, EveryWrongFormIsFound) {
     const Paths good;
-    struct Row {
-        const char* what;
-        Buffer buffer;
-    };
-    const Row rows[] = {
+    const std::pair<const char*, Buffer> rows[] = {
         {"nothing", {}},
         {"no item", Items().buffer()},
         {"only a status", Items().number(CM_KERN_REPLY_STATUS, 1).buffer()},
@@ -151,12 +142,12 @@ TEST(Reply, EveryWrongFormIsFound) {
         {"a status that is text", Items().text(CM_KERN_REPLY_STATUS, "1").buffer()},
         {"a path that is a number", Items().number(CM_KERN_REPLY_DATA_CONTAINER_PATH, 1).buffer()},
     };
-    for (const Row& row : rows)
-        EXPECT_NE(problemOf(row.buffer), "") << row.what;
+    for (const auto& [what, buffer] : rows)
+        EXPECT_NE(problemOf(buffer), "") << what;
 }
 
-// Goal: no damage makes a path believed that is no container's. Method: every byte of a good answer in turn takes each
-// of a few values, every cut; what is still believed has to be where containers are.
+// Every byte of a good answer in turn takes each of a few values, and every cut: what is still believed is a
+// container's place.
 TEST(Reply, DamageNeverLeadsAway) {
     const Buffer good = Paths().items().buffer();
     const auto judge = [](const Buffer& buffer) {

@@ -4,9 +4,7 @@
 #include "support/FileTree.h"
 
 #include <filesystem>
-#include <fstream>
 #include <sys/stat.h>
-#include <thread>
 
 namespace zor::soak {
 
@@ -14,7 +12,7 @@ namespace {
 
 namespace files = std::filesystem;
 
-constexpr std::uint64_t dataApplication = 2;
+using whole::dataApplication;
 
 /// Where the second user's containers lie and what leads there, at every depth.
 std::vector<std::string> victimsBelow(const std::string& home) {
@@ -35,8 +33,8 @@ std::vector<std::string> victimsBelow(const std::string& home) {
 HostileOwner::HostileOwner(Session& session, std::uint64_t seed)
     : session_(session), asking_(seed, 1000), swapping_(seed, 1001), outside_(session.root() + "/outside") {
     files::create_directories(outside_ + "/Data/Application/tmp");
-    std::ofstream(outside_ + "/file") << "untouched";
-    std::ofstream(outside_ + "/Data/Application/.com.veltra.zorvane.metadata.plist") << "untouched";
+    whole::writeFile(outside_ + "/file", "untouched");
+    whole::writeFile(outside_ + "/Data/Application/" + whole::metadataFile, "untouched");
     before_ = support::readTree(outside_).describe();
 }
 
@@ -45,56 +43,48 @@ std::string HostileOwner::changedOutside() const {
     return now == before_ ? "" : before_ + "\nbecame\n" + now;
 }
 
+zorvane::Result<void> HostileOwner::askOnce(zorvane::Client& client) {
+    const std::string identifier = "org.hostile." + std::to_string(asking_.upTo(4));
+    const auto made = client.createOrLookup({.containerClass = dataApplication,
+                                             .user = hostileUser,
+                                             .identifier = identifier,
+                                             .create = true,
+                                             .transient = asking_.oneIn(3)});
+    session_.did("hostile", "hostile request", identifier);
+    if (!made)
+        return std::unexpected(made.error());
+    const zorvane::Client::Address address{dataApplication, hostileUser, identifier, made->uuid};
+    switch (asking_.upTo(7)) {
+    case 0:
+        return client.wipe(dataApplication, hostileUser, identifier);
+    case 1:
+        return client.recreateDefaultStructure(address);
+    case 2:
+        return client.regenerateDirectoryUUID(address);
+    case 3:
+        if (const auto size = client.diskUsage(address); !size)
+            return std::unexpected(size.error());
+        return {};
+    case 4:
+        return client.stageForDelete({address});
+    case 5:
+        return client.setInfoValue(address, "k", zorvane::Value{std::string("v")});
+    default:
+        return client.setDataProtection({.containerClass = dataApplication,
+                                         .user = hostileUser,
+                                         .identifier = identifier,
+                                         .protectionClass = asking_.oneIn(2) ? 1 : 3});
+    }
+}
+
 void HostileOwner::ask() {
     std::optional<zorvane::Client> client;
     while (!session_.stopped) {
         if (!client) {
-            auto connected = zorvane::Client::connect(session_.daemon().connection());
-            if (connected)
-                client.emplace(std::move(*connected));
-            else
-                std::this_thread::sleep_for(std::chrono::milliseconds(2));
+            session_.connect(client);
             continue;
         }
-        const std::string identifier = "org.hostile." + std::to_string(asking_.upTo(4));
-        const auto made = client->createOrLookup({.containerClass = dataApplication,
-                                                  .user = hostileUser,
-                                                  .identifier = identifier,
-                                                  .create = true,
-                                                  .transient = asking_.oneIn(3)});
-        session_.did("hostile", "hostile request", identifier);
-        zorvane::Result<void> last;
-        if (made) {
-            const zorvane::Client::Address address{dataApplication, hostileUser, identifier, made->uuid};
-            switch (asking_.upTo(7)) {
-            case 0:
-                last = client->wipe(dataApplication, hostileUser, identifier);
-                break;
-            case 1:
-                last = client->recreateDefaultStructure(address);
-                break;
-            case 2:
-                last = client->regenerateDirectoryUUID(address);
-                break;
-            case 3:
-                if (const auto size = client->diskUsage(address); !size)
-                    last = std::unexpected(size.error());
-                break;
-            case 4:
-                last = client->stageForDelete({address});
-                break;
-            case 5:
-                last = client->setInfoValue(address, "k", zorvane::Value{std::string("v")});
-                break;
-            default:
-                last = client->setDataProtection({.containerClass = dataApplication,
-                                                  .user = hostileUser,
-                                                  .identifier = identifier,
-                                                  .protectionClass = asking_.oneIn(2) ? 1 : 3});
-            }
-        } else {
-            last = std::unexpected(made.error());
-        }
+        const auto last = askOnce(*client);
         if (last)
             continue;
         if (last.error().kind == zorvane::Error::Kind::timedOut)
@@ -110,30 +100,22 @@ void HostileOwner::swapOnce(const std::string& victim) {
     if (files::canonical(victim, error) != victim)
         return;
     const std::string aside = victim + ".aside";
-    switch (swapping_.upTo(5)) {
-    case 0: // a link in its place for a moment
-        files::rename(victim, aside, error);
-        if (error)
-            return;
-        files::create_symlink(outside_ + "/Data/Application", victim, error);
-        break;
-    case 1: // a pipe
-        files::rename(victim, aside, error);
-        if (error)
-            return;
-        ::mkfifo(victim.c_str(), 0666);
-        break;
-    case 2: // gone for a moment
-        files::rename(victim, aside, error);
-        break;
-    case 3: // a second name of what lies outside
+    const auto trick = swapping_.upTo(5);
+    if (trick == 3) // a second name of what lies outside
         if (files::canonical(victim + "/tmp", error) == victim + "/tmp")
             files::create_hard_link(outside_ + "/file", victim + "/tmp/" + std::to_string(swapping_.upTo(9)), error);
-        return;
-    default:
+    if (trick == 4)
         files::remove_all(victim, error);
+    if (trick > 2)
         return;
-    }
+    // Gone for a moment, or a link or a pipe in its place.
+    files::rename(victim, aside, error);
+    if (error && trick < 2)
+        return;
+    if (trick == 0)
+        files::create_symlink(outside_ + "/Data/Application", victim, error);
+    else if (trick == 1)
+        ::mkfifo(victim.c_str(), 0666);
     std::this_thread::sleep_for(std::chrono::microseconds(swapping_.upTo(3000)));
     // What the daemon has made there meanwhile goes, or stays under another name.
     if (!files::is_directory(files::symlink_status(victim, error)))
@@ -146,7 +128,7 @@ void HostileOwner::swap() {
         const auto victims = victimsBelow(session_.root() + "/" + hostileHome);
         for (unsigned i = 0; i < 8 && !session_.stopped; ++i)
             swapOnce(victims[swapping_.upTo(victims.size())]);
-        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+        sleepMilliseconds(1);
     }
 }
 

@@ -4,7 +4,6 @@
 // what lies outside stays as it is.
 #pragma once
 
-#include "soak/Choices.h"
 #include "soak/Session.h"
 
 namespace zor::soak {
@@ -23,6 +22,7 @@ public:
     [[nodiscard]] std::string changedOutside() const;
 
 private:
+    zorvane::Result<void> askOnce(zorvane::Client& client);
     void swapOnce(const std::string& victim);
 
     Session& session_;

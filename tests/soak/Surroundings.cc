@@ -7,16 +7,11 @@
 #include <nlohmann/json.hpp>
 #include <set>
 #include <sys/resource.h>
-#include <thread>
 #include <unistd.h>
 
 namespace zor::soak {
 
 namespace {
-
-void sleepMilliseconds(std::uint64_t milliseconds) {
-    std::this_thread::sleep_for(std::chrono::milliseconds(milliseconds));
-}
 
 /// What may be found of a store in use: clients take directories away, a kill comes amid a change of the protection
 /// class, errors leave what the next start clears.
@@ -48,25 +43,29 @@ void Surroundings::happen(unsigned pauseMillisecondsMax) {
         starve();
 }
 
+void Surroundings::end() {
+    session_.did("device", "kill");
+    session_.daemon().kill();
+    ++kills_;
+}
+
 void Surroundings::kill() {
-    session_.did("device", "kill", "");
-    whole::DaemonProcess& daemon = session_.daemon();
     if (choices_.oneIn(10)) {
-        if (const int status = daemon.terminate(); status != 0)
+        session_.did("device", "orderly end");
+        ++kills_;
+        if (const int status = session_.daemon().terminate(); status != 0)
             session_.found("an orderly end gives exit status " + std::to_string(status));
     } else {
-        daemon.kill();
+        end();
     }
-    ++kills_;
-    daemon.start();
+    session_.daemon().start();
     if (choices_.oneIn(4))
         check();
 }
 
 void Surroundings::boot() {
-    session_.did("device", "boot", "");
-    session_.daemon().kill();
-    ++kills_;
+    session_.did("device", "boot");
+    end();
     ++boots_;
     session_.daemon().start({"--forget-boot"});
     check();
@@ -74,8 +73,7 @@ void Surroundings::boot() {
 
 void Surroundings::lock(bool locked) {
     const std::unique_lock silence(session_.requests);
-    const auto outcome = whole::runProgram(
-        {whole::programPath("zorvanectl"), "--root", session_.root(), "lock-state", locked ? "1" : "0"});
+    const auto outcome = session_.daemon().tool({"lock-state", locked ? "1" : "0"});
     if (outcome.exitStatus != 0)
         session_.found("lock-state: " + outcome.output);
     session_.locked = locked;
@@ -88,7 +86,7 @@ void Surroundings::enter(Trouble trouble) {
 
 void Surroundings::fillDisk() {
     enter(Trouble::diskFull);
-    session_.did("device", "full disk", "");
+    session_.did("device", "full disk");
     const std::string filler = session_.root() + "/filler";
     {
         std::ofstream file(filler, std::ios::binary);
@@ -98,20 +96,18 @@ void Surroundings::fillDisk() {
     }
     sleepMilliseconds(100 + choices_.upTo(300));
     if (choices_.oneIn(2)) {
-        session_.did("device", "kill", "");
-        session_.daemon().kill();
-        ++kills_;
+        end();
         ::unlink(filler.c_str());
         session_.daemon().start();
     }
     ::unlink(filler.c_str());
     enter(Trouble::none);
-    session_.did("device", "room again", "");
+    session_.did("device", "room again");
 }
 
 void Surroundings::starve() {
     enter(Trouble::fewDescriptors);
-    session_.did("device", "few descriptors", "");
+    session_.did("device", "few descriptors");
     const pid_t pid = session_.daemon().pid();
     rlimit before{};
     ::prlimit(pid, RLIMIT_NOFILE, nullptr, &before);
@@ -120,7 +116,7 @@ void Surroundings::starve() {
     sleepMilliseconds(50 + choices_.upTo(200));
     ::prlimit(pid, RLIMIT_NOFILE, &before, nullptr);
     enter(Trouble::none);
-    session_.did("device", "descriptors again", "");
+    session_.did("device", "descriptors again");
 }
 
 void Surroundings::settle() {
@@ -130,9 +126,8 @@ void Surroundings::settle() {
 
 void Surroundings::check() {
     const std::unique_lock silence(session_.requests);
-    const auto outcome =
-        whole::runProgram({whole::programPath("zorvanectl"), "--root", session_.root(), "--json", "check"});
-    session_.did("device", "check", "");
+    const auto outcome = session_.daemon().tool({"--json", "check"});
+    session_.did("device", "check");
     const auto document = nlohmann::json::parse(outcome.output, nullptr, false);
     if (document.is_discarded() || !document.contains("findings")) {
         session_.found("check says: " + outcome.output);

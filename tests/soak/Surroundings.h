@@ -3,7 +3,6 @@
 // what must hold whenever it starts again.
 #pragma once
 
-#include "soak/Choices.h"
 #include "soak/Session.h"
 
 namespace zor::soak {
@@ -21,12 +20,16 @@ public:
     struct Size {
         std::size_t residentKiB = 0;
         std::size_t descriptors = 0;
+        [[nodiscard]] std::string text() const {
+            return std::to_string(residentKiB) + " KiB, " + std::to_string(descriptors) + " descriptors";
+        }
     };
     [[nodiscard]] Size size() const;
-    [[nodiscard]] std::uint64_t kills() const { return kills_; }
-    [[nodiscard]] std::uint64_t boots() const { return boots_; }
+    [[nodiscard]] Count kills() const { return kills_; }
+    [[nodiscard]] Count boots() const { return boots_; }
 
 private:
+    void end();
     void kill();
     void boot();
     void lock(bool locked);
@@ -37,8 +40,8 @@ private:
     Session& session_;
     Choices choices_;
     const bool diskCanBeFilled_;
-    std::uint64_t kills_ = 0;
-    std::uint64_t boots_ = 0;
+    Count kills_ = 0;
+    Count boots_ = 0;
 };
 
 } // namespace zor::soak

@@ -10,7 +10,6 @@
 #include <CLI/CLI.hpp>
 #include <cstdio>
 #include <sys/mount.h>
-#include <thread>
 #include <unistd.h>
 
 namespace zor::soak {
@@ -20,14 +19,13 @@ using Clock = std::chrono::steady_clock;
 
 constexpr std::size_t diskBytes = std::size_t{96} << 20;
 constexpr unsigned clientCount = 4;
-constexpr std::uint32_t mobileUser = 501;
 constexpr std::size_t grownKiBMax = 16384;
 constexpr std::size_t grownDescriptorsMax = 16;
 
 struct Options {
     double seconds = 60;
-    std::uint64_t kills = 0;
-    std::uint64_t seed = static_cast<std::uint64_t>(Clock::now().time_since_epoch().count()) % 1'000'000;
+    Count kills = 0;
+    Count seed = static_cast<Count>(Clock::now().time_since_epoch().count()) % 1'000'000;
     bool verbose = false;
 };
 
@@ -52,13 +50,12 @@ private:
 };
 
 void say(const Session& session, const Surroundings& surroundings, double seconds) {
-    std::uint64_t operations = 0;
-    for (const auto& [name, count] : session.counts())
+    Count operations = 0;
+    for (const auto& [name, count] : session.record().counts)
         operations += count;
     const auto size = surroundings.size();
-    std::printf("%6.0f s: %llu operations, %llu kills, %llu boots, %zu KiB, %zu descriptors\n", seconds,
-                static_cast<unsigned long long>(operations), static_cast<unsigned long long>(surroundings.kills()),
-                static_cast<unsigned long long>(surroundings.boots()), size.residentKiB, size.descriptors);
+    std::printf("%6.0f s: %llu operations, %llu kills, %llu boots, %s\n", seconds, operations, surroundings.kills(),
+                surroundings.boots(), size.text().c_str());
     std::fflush(stdout);
 }
 
@@ -85,7 +82,7 @@ void calm(Session& session, const Surroundings& surroundings, double seconds) {
     const auto wait = [&](double time) {
         for (const auto end = Clock::now() + std::chrono::duration<double>(time);
              Clock::now() < end && !session.stopped;)
-            std::this_thread::sleep_for(std::chrono::milliseconds(50));
+            sleepMilliseconds(50);
     };
     wait(seconds / 3);
     const auto before = surroundings.size();
@@ -93,30 +90,28 @@ void calm(Session& session, const Surroundings& surroundings, double seconds) {
     const auto after = surroundings.size();
     if (after.residentKiB > before.residentKiB + grownKiBMax ||
         after.descriptors > before.descriptors + grownDescriptorsMax)
-        session.found("the daemon grew from " + std::to_string(before.residentKiB) + " KiB and " +
-                      std::to_string(before.descriptors) + " descriptors to " + std::to_string(after.residentKiB) +
-                      " KiB and " + std::to_string(after.descriptors));
+        session.found("the daemon grew from " + before.text() + " to " + after.text());
 }
 
 int report(const Session& session, const Surroundings& surroundings, double seconds, const std::string& log) {
     say(session, surroundings, seconds);
-    for (const auto& [name, count] : session.counts())
-        std::printf("  %8llu  %s\n", static_cast<unsigned long long>(count), name.c_str());
-    const auto findings = session.findings();
-    if (findings.empty()) {
+    const auto record = session.record();
+    for (const auto& [name, count] : record.counts)
+        std::printf("  %8llu  %s\n", count, name.c_str());
+    if (record.findings.empty()) {
         std::puts("nothing was found");
         return 0;
     }
-    for (const std::string& operation : session.lastOperations())
+    for (const std::string& operation : record.lastOperations)
         std::printf("  last: %s\n", operation.c_str());
     std::printf("%s\n", log.substr(log.size() > 4000 ? log.size() - 4000 : 0).c_str());
-    for (const std::string& finding : findings)
+    for (const std::string& finding : record.findings)
         std::printf("FOUND: %s\n", finding.c_str());
     return 1;
 }
 
 int soak(const Options& options) {
-    std::printf("seed %llu\n", static_cast<unsigned long long>(options.seed));
+    std::printf("seed %llu\n", options.seed);
     const SmallDisk disk;
     if (!disk.isMounted())
         std::puts("skipped: a full disk, and clients of several users; only root may mount and become others");
@@ -127,15 +122,9 @@ int soak(const Options& options) {
     HostileOwner hostile(session, options.seed);
     const auto begin = Clock::now();
 
-    std::vector<std::unique_ptr<Life>> lives;
     std::vector<std::thread> threads;
-    for (unsigned i = 0; i < clientCount; ++i) {
-        lives.push_back(std::make_unique<Life>(session, i, i % 2 == 0 ? 0 : mobileUser, options.seed));
-        threads.emplace_back([&life = *lives.back()] {
-            life.live();
-            life.lookAtAll();
-        });
-    }
+    for (unsigned i = 0; i < clientCount; ++i)
+        threads.emplace_back([&, i] { live(session, i, i % 2 == 0 ? 0 : whole::mobile, options.seed); });
     threads.emplace_back([&] { hostile.ask(); });
     threads.emplace_back([&] { hostile.swap(); });
     trouble(session, surroundings, options);

@@ -6,10 +6,8 @@
 #include "world/World.h"
 
 #include <algorithm>
-#include <atomic>
 #include <gtest/gtest.h>
 #include <set>
-#include <thread>
 #include <unistd.h>
 
 namespace zor::test {
@@ -21,7 +19,6 @@ using support::DiskCall;
 using support::DiskCallInfo;
 using support::hasLine;
 
-const std::string file = std::string(libraryPath) + "/zor_entitlements.plist";
 const char* const apps = "com.veltra.security.application-groups";
 const char* const groups = "com.veltra.security.system-groups";
 const char* const groupContainers = "com.veltra.security.system-group-containers";
@@ -46,10 +43,7 @@ protected:
                                              identifier ? &*identifier : nullptr, &options);
     }
     std::string make(std::uint32_t user, const std::string& identifier, ContainerClass containerClass) {
-        return world.daemonsClient()
-            .createOrLookupContainerForUser(user, &identifier, containerClass, {.createIfNecessary = true})
-            .value()
-            .path;
+        return world.make(identifier, containerClass, false, user).path;
     }
     /// How often the file was replaced meanwhile.
     template <typename Function>
@@ -66,17 +60,14 @@ protected:
     void boot() {
         world.restart();
         world.load();
-        world.daemonsClient().rebootContainerManagerSetup();
-        world.daemonsClient().containerManagerSetup();
-        world.drainDeathRow();
+        world.boot();
     }
 
     World world;
 };
 
-// Goal: a change lets go exactly the containers whose last reference it takes away, for every user that has them.
-// Method: a table of what "a" and others had and what "a" gets; each group has a container of each kind and user; those
-// that went are compared.
+// Goal: exactly the containers whose last reference goes are let go, for every user that has them.
+// Method: what "a" and "other" had and what "a" gets; each group has a container of each kind and user.
 TEST_F(Processing, WhatAChangeReleases) {
     struct Row {
         const char* name;
@@ -85,60 +76,50 @@ TEST_F(Processing, WhatAChangeReleases) {
         std::optional<Dictionary> after;
         std::set<std::string> gone;
     };
-    const Dictionary both{{apps, Array{"g", "h"}}};
+    const std::optional<Dictionary> none;
     const Dictionary unrelated{{"k", 1}};
+    const Dictionary g{{apps, Array{"g"}}};
+    const Dictionary h{{apps, Array{"h"}}};
+    const Dictionary both{{apps, Array{"g", "h"}}};
+    const Dictionary text{{apps, "g"}};
+    const Dictionary twice{{apps, Array{"g", "g"}}};
+    const Dictionary mixed{{apps, Array{5, "g"}}};
+    const Dictionary more{{apps, Array{"g"}}, {"k", 1}};
+    const Dictionary otherKind{{apps, Array{"systemgroup.s"}}};
+    const Dictionary s{{groups, Array{"systemgroup.s"}}};
+    const Dictionary byOtherKey{{groupContainers, Array{"systemgroup.s"}}};
+    const Dictionary firstEmpty{{groups, Array{}}, {groupContainers, Array{"systemgroup.s"}}};
+    const Dictionary hidden{{groups, Array{"systemgroup.t"}}, {groupContainers, Array{"systemgroup.s"}}};
+    const Dictionary unprefixed{{groups, Array{"unprefixed"}}};
+    const Dictionary container{{systemContainer, true}};
     const Row rows[] = {
-        {"one of two", both, {}, Dictionary{{apps, Array{"h"}}}, {"g"}},
-        {"another order", both, {}, Dictionary{{apps, Array{"h", "g"}}}, {}},
-        {"everything", both, {}, {}, {"g", "h"}},
-        {"everything, as an empty dictionary", both, {}, Dictionary{}, {"g", "h"}},
-        {"another holds it", both, Dictionary{{apps, Array{"g"}}}, {}, {"h"}},
-        {"another holds it among things that are none", both, Dictionary{{apps, Array{5, "g"}}}, {}, {"h"}},
-        {"another's string does not count", both, Dictionary{{apps, "g"}}, {}, {"g", "h"}},
-        {"listed twice", Dictionary{{apps, Array{"g", "g"}}}, {}, {}, {}},
-        {"its own string does not count", Dictionary{{apps, "g"}}, {}, {}, {}},
-        {"the one counted is another's", Dictionary{{apps, "g"}}, Dictionary{{apps, Array{"g"}}}, {}, {}},
-        {"from a list to a string", Dictionary{{apps, Array{"g"}}}, {}, Dictionary{{apps, "g"}}, {}},
-        {"what is no list means none", Dictionary{{apps, Array{"g"}}}, {}, Dictionary{{apps, Array{"g", 5}}}, {"g"}},
-        {"only another key", Dictionary{{apps, Array{"g"}}, {"k", 1}}, {}, Dictionary{{apps, Array{"g"}}}, {}},
-        {"another group", Dictionary{{apps, Array{"g"}}}, {}, Dictionary{{apps, Array{"h"}}}, {"g"}},
-        {"the same name of another kind", Dictionary{{apps, Array{"systemgroup.s"}}}, {}, {}, {}},
-        {"a system group", Dictionary{{groups, Array{"systemgroup.s"}}}, {}, unrelated, {"systemgroup.s"}},
-        {"by the other key", Dictionary{{groupContainers, Array{"systemgroup.s"}}}, {}, {}, {"systemgroup.s"}},
-        {"the first key is empty",
-         Dictionary{{groups, Array{}}, {groupContainers, Array{"systemgroup.s"}}},
-         {},
-         {},
-         {"systemgroup.s"}},
-        {"from key to key",
-         Dictionary{{groups, Array{"systemgroup.s"}}},
-         {},
-         Dictionary{{groupContainers, Array{"systemgroup.s"}}},
-         {}},
-        {"another holds it by the other key",
-         Dictionary{{groups, Array{"systemgroup.s"}}},
-         Dictionary{{groupContainers, Array{"systemgroup.s"}}},
-         {},
-         {}},
-        {"the other key is hidden",
-         Dictionary{{groups, Array{"systemgroup.t"}}, {groupContainers, Array{"systemgroup.s"}}},
-         {},
-         {},
-         {}},
-        {"without its prefix", Dictionary{{groups, Array{"unprefixed"}}}, {}, {}, {}},
-        {"a system container", Dictionary{{systemContainer, true}}, {}, unrelated, {"a"}},
-        {"a system container, false",
-         Dictionary{{systemContainer, true}},
-         {},
-         Dictionary{{systemContainer, false}},
-         {"a"}},
-        {"a system container, 1", Dictionary{{systemContainer, true}}, {}, Dictionary{{systemContainer, 1}}, {"a"}},
-        {"a system container kept",
-         Dictionary{{systemContainer, true}},
-         {},
-         Dictionary{{systemContainer, true}, {"k", 1}},
-         {}},
-        {"a system container it never had", unrelated, Dictionary{{systemContainer, true}}, {}, {}},
+        {"one of two", both, none, h, {"g"}},
+        {"another order", both, none, Dictionary{{apps, Array{"h", "g"}}}, {}},
+        {"everything", both, none, none, {"g", "h"}},
+        {"everything, as an empty dictionary", both, none, Dictionary{}, {"g", "h"}},
+        {"another holds it", both, g, none, {"h"}},
+        {"another holds it among things that are none", both, mixed, none, {"h"}},
+        {"another's string does not count", both, text, none, {"g", "h"}},
+        {"listed twice", twice, none, none, {}},
+        {"its own string does not count", text, none, none, {}},
+        {"the one counted is another's", text, g, none, {}},
+        {"from a list to a string", g, none, text, {}},
+        {"what is no list means none", g, none, mixed, {"g"}},
+        {"only another key", more, none, g, {}},
+        {"another group", g, none, h, {"g"}},
+        {"the same name of another kind", otherKind, none, none, {}},
+        {"a system group", s, none, unrelated, {"systemgroup.s"}},
+        {"by the other key", byOtherKey, none, none, {"systemgroup.s"}},
+        {"the first key is empty", firstEmpty, none, none, {"systemgroup.s"}},
+        {"from key to key", s, none, byOtherKey, {}},
+        {"another holds it by the other key", s, byOtherKey, none, {}},
+        {"the other key is hidden", hidden, none, none, {}},
+        {"without its prefix", unprefixed, none, none, {}},
+        {"a system container", container, none, unrelated, {"a"}},
+        {"a system container, false", container, none, Dictionary{{systemContainer, false}}, {"a"}},
+        {"a system container, 1", container, none, Dictionary{{systemContainer, 1}}, {"a"}},
+        {"a system container kept", container, none, Dictionary{{systemContainer, true}, {"k", 1}}, {}},
+        {"a system container it never had", unrelated, container, none, {}},
     };
     for (const Row& row : rows) {
         SCOPED_TRACE(row.name);
@@ -156,18 +137,17 @@ TEST_F(Processing, WhatAChangeReleases) {
             paths.emplace(identifier, make(499, identifier, ContainerClass::dataSystem));
         EXPECT_LE(writesDuring([&] { EXPECT_EQ(process(row.after, "a"), ErrorCode::success); }), 1U);
         std::set<std::string> gone;
-        for (const auto& [identifier, path] : paths)
-            if (::access(path.c_str(), F_OK) != 0)
+        for (const auto& [identifier, path] : paths) {
+            EXPECT_EQ(isThere(path), !row.gone.contains(identifier)) << path;
+            if (!isThere(path))
                 gone.insert(identifier);
+        }
         EXPECT_EQ(gone, row.gone);
-        for (const auto& [identifier, path] : paths)
-            EXPECT_EQ(::access(path.c_str(), F_OK) != 0, row.gone.contains(identifier)) << path;
     }
     EXPECT_FALSE(world.exists("private/var/nowhere"));
 }
 
-// Goal: children and flags are recorded and forgotten as the options say, with one write for a call that changes
-// something and none for one that does not. Method: calls in a row, the whole map after each.
+// Goal: children and flags as the options say, one write for each change. Method: the whole map after each call.
 TEST_F(Processing, TheMapAfterEachCall) {
     const Dictionary e{{"k", 1}};
     const Dictionary caller{{byCaller, true}};
@@ -240,14 +220,19 @@ TEST_F(Processing, TheMapAfterEachCall) {
     EXPECT_EQ(mapping().entitlementMappingDict(), (Dictionary{{"kept", e}, {byCaller, Dictionary{{"kept", true}}}}));
 }
 
-// Goal: a change that could not be saved is 59 and no later call is answered with success before it is; one that no
-// file could hold is refused for itself. Method: a disk that refuses once; a dictionary too large.
+// Goal: an unsaved change is 59, and no later call succeeds before it is saved; one no file can hold is refused.
+// Method: a disk that refuses once; a dictionary too large.
 TEST_F(Processing, ChangesThatCannotBeSaved) {
     const Dictionary e{{"k", 1}};
-    const auto renaming = [](const DiskCallInfo& call) { return call.call == DiskCall::rename; };
     for (const char* identifier : {"a", "a", "never there"}) {
-        world.disk().arm({.error = ENOSPC, .filter = renaming});
+        world.refuse(DiskCall::rename, ENOSPC);
+        world.log.take();
         EXPECT_EQ(process(e, "a"), ErrorCode::entitlementFileNotWritten);
+        EXPECT_TRUE(hasLine(world.log.take(), 3, "_setEntitlementDictionaryValues",
+                            "Error writing entitlement mappings to disk after set : ZORErrorDomain 59 \"Failed to "
+                            "write entitlement mapping file at " +
+                                world.path(entitlementFile) + "\""));
+        EXPECT_TRUE(mapping().entitlementsExistForIdentifier("a"));
         EXPECT_EQ(process(std::string(identifier) == "a" ? std::optional(e) : std::nullopt, identifier),
                   ErrorCode::success);
         world.disk().disarm();
@@ -263,8 +248,7 @@ TEST_F(Processing, ChangesThatCannotBeSaved) {
     EXPECT_EQ(process(e, "b"), ErrorCode::success);
 }
 
-// Goal: the boot removes groups that nobody lists, of users that are there, and keeps those of lists in any key.
-// Method: containers of each, then a boot.
+// Goal: a boot removes exactly the groups that nobody lists. Method: containers of each kind, then a boot.
 TEST_F(Processing, ABootRemovesGroupsWithoutReferences) {
     ASSERT_EQ(process(Dictionary{{apps, Array{"g", "g"}}, {groupContainers, Array{"systemgroup.s", "bare"}}}, "a"),
               ErrorCode::success);
@@ -281,24 +265,21 @@ TEST_F(Processing, ABootRemovesGroupsWithoutReferences) {
     gone.push_back(make(499, "g", ContainerClass::sharedSystemGroup));
     boot();
     for (const std::string& path : kept)
-        EXPECT_EQ(::access(path.c_str(), F_OK), 0) << path;
+        EXPECT_TRUE(isThere(path)) << path;
     for (const std::string& path : gone)
-        EXPECT_NE(::access(path.c_str(), F_OK), 0) << path;
+        EXPECT_FALSE(isThere(path)) << path;
     EXPECT_TRUE(hasLine(world.log.take(), 3, "_cleanupUnreferencedGroupContainersForUser",
                         "Removing group container with identifier h for 502"));
 }
 
-// Goal: while an unreadable file lies aside, no group goes for want of a reference, at boots and at releases, and it
-// does when the file is gone. Method: two boots over a lost file with registrations between them, then one without.
+// Goal: while an unreadable file lies aside no group goes. Method: two boots over it, releases between, one without.
 TEST_F(Processing, ALostFileStopsDeletions) {
     const Dictionary entitled{{apps, Array{"g"}}, {groups, Array{"systemgroup.s"}}};
     ASSERT_EQ(process(entitled, "a"), ErrorCode::success);
     const std::string paths[] = {make(mobile, "g", ContainerClass::sharedAppGroup),
                                  make(499, "systemgroup.s", ContainerClass::sharedSystemGroup)};
-    const auto count = [&] {
-        return std::ranges::count_if(paths, [](const auto& path) { return ::access(path.c_str(), F_OK) == 0; });
-    };
-    world.write(file, "nonsense");
+    const auto count = [&] { return std::ranges::count_if(paths, isThere); };
+    world.write(entitlementFile, "nonsense");
     for (const char* bootName : {"first", "second"}) {
         SCOPED_TRACE(bootName);
         boot();
@@ -319,8 +300,7 @@ TEST_F(Processing, ALostFileStopsDeletions) {
     EXPECT_EQ(count(), 0);
 }
 
-// Goal: paths are the same at every asking, only of groups that the identifier has, only for users who have a home;
-// what one disk error costs is one group. Method: askings in a row.
+// Goal: paths last, are of own groups and users with a home; a disk error costs one. Method: askings in a row.
 TEST_F(Processing, GroupPaths) {
     ASSERT_EQ(process(Dictionary{{apps, Array{"g", "h"}}, {groups, Array{"systemgroup.s", "bare"}}}, "a"),
               ErrorCode::success);
@@ -328,65 +308,54 @@ TEST_F(Processing, GroupPaths) {
     const std::string a = "a";
     const std::string b = "b";
     ZORGroupManager& manager = world.services().groups();
-    const auto keysOf = [](const Result<ZORGroupManager::Paths>& paths) {
-        std::set<std::string> found;
-        for (const auto& [group, path] : *paths)
-            found.insert(group);
-        return found;
+    const auto pathsOf = [&](std::uint32_t user) {
+        return manager.groupContainerPathsForUser(user, *client, &a).value();
     };
     EXPECT_FALSE(client->allowGroupIdLookup());
     EXPECT_TRUE(manager.groupContainerPathsForUser(mobile, *client, &b)->empty());
     EXPECT_TRUE(client->allowGroupIdLookup());
-    world.disk().arm(
-        {.error = ENOSPC, .filter = [](const DiskCallInfo& call) { return call.call == DiskCall::createFile; }});
+    world.refuse(DiskCall::createFile, ENOSPC);
     world.log.take();
-    EXPECT_EQ(keysOf(manager.groupContainerPathsForUser(mobile, *client, &a)), (std::set<std::string>{"h"}));
+    EXPECT_EQ(pathsOf(mobile).size(), 1U);
     world.disk().disarm();
     EXPECT_TRUE(hasLine(world.log.take(), 3, "groupContainerPathsForUser",
                         "Failed to create or lookup group container-userId: 501, ID: a : 34"));
-    const auto paths = manager.groupContainerPathsForUser(mobile, *client, &a);
-    EXPECT_EQ(keysOf(paths), (std::set<std::string>{"g", "h"}));
-    EXPECT_EQ(*manager.groupContainerPathsForUser(mobile, *client, &a), *paths);
-    EXPECT_NE(*manager.groupContainerPathsForUser(second, *client, &a), *paths);
-    EXPECT_EQ(keysOf(manager.groupContainerPathsForUser(499, *client, &a)), (std::set<std::string>{"systemgroup.s"}));
-    EXPECT_TRUE(manager.groupContainerPathsForUser(504, *client, &a)->empty()); // no such user
-    EXPECT_EQ(*manager.groupContainerIdentifiersForUser(499, &a), (std::vector<std::string>{"g", "h"}));
-    EXPECT_TRUE(manager.groupContainerIdentifiersForUser(mobile, &b)->empty());
-    for (const auto& error : {manager.groupContainerPathsForUser(mobile, *client, nullptr).error(),
-                              manager.groupContainerIdentifiersForUser(mobile, nullptr).error()}) {
-        EXPECT_TRUE(error.is(ErrorCode::invalidObject));
-        EXPECT_EQ(error.description(), "Can't act on an invalid object: userId: 501, ID: (null)");
-    }
+    const auto paths = pathsOf(mobile);
+    EXPECT_EQ(paths.size(), 2U);
+    EXPECT_EQ(pathsOf(mobile), paths);
+    EXPECT_NE(pathsOf(second), paths);
+    EXPECT_EQ(pathsOf(499).size(), 1U);
+    EXPECT_TRUE(pathsOf(504).empty()); // no such user
+    const std::string invalid = "11 Can't act on an invalid object: userId: 501, ID: (null)";
+    EXPECT_EQ(complaintOf(manager.groupContainerPathsForUser(mobile, *client, nullptr)), invalid);
+    EXPECT_EQ(complaintOf(manager.groupContainerIdentifiersForUser(mobile, nullptr)), invalid);
 }
 
-// Goal: whoever holds a group has its container throughout, however often others come and go. Method: one identifier
-// asks for its paths while others register and leave; its container stays the same one.
+// Goal: who holds a group keeps its container. Method: others register and leave, each seeing itself, meanwhile.
 TEST_F(Processing, AHeldGroupStaysWhileOthersComeAndGo) {
     const Dictionary entitled{{apps, Array{"g"}}};
     const std::string holder = "holder";
     ASSERT_EQ(process(entitled, holder), ErrorCode::success);
     const std::string path = make(mobile, "g", ContainerClass::sharedAppGroup);
-    constexpr int rounds = 30;
+    constexpr int others = 3;
     std::atomic<int> wrong{0};
-    std::vector<std::thread> threads;
-    for (int t = 0; t < 3; ++t)
-        threads.emplace_back([&, t] {
-            for (int i = 0; i < rounds; ++i)
-                wrong += process(i % 2 == 0 ? std::optional(entitled) : std::nullopt, "id" + std::to_string(t)) !=
-                         ErrorCode::success;
-        });
-    threads.emplace_back([&] {
+    inParallel(others + 1, [&](int thread) {
         const auto client = world.client({.bundleIdentifier = holder, .userId = mobile});
-        for (int i = 0; i < rounds; ++i) {
+        for (int i = 0; i < 30; ++i) {
+            if (thread < others) {
+                const std::string own = "id" + std::to_string(thread);
+                const bool registers = i % 2 == 0;
+                wrong += process(registers ? std::optional(entitled) : std::nullopt, own) != ErrorCode::success;
+                wrong += mapping().entitlementsExistForIdentifier(own) != registers;
+                continue;
+            }
             const auto paths = world.services().groups().groupContainerPathsForUser(mobile, *client, &holder);
-            wrong += !paths || *paths != ZORGroupManager::Paths{{"g", path}} || ::access(path.c_str(), F_OK) != 0;
+            wrong += !paths || *paths != ZORGroupManager::Paths{{"g", path}} || !isThere(path);
         }
     });
-    for (std::thread& thread : threads)
-        thread.join();
     EXPECT_EQ(wrong, 0);
     ASSERT_EQ(process({}, holder), ErrorCode::success);
-    EXPECT_NE(::access(path.c_str(), F_OK), 0);
+    EXPECT_FALSE(isThere(path));
 }
 
 } // namespace

@@ -4,30 +4,34 @@
 #include "protection/ZORApplicationTerminationAssertion.h"
 #include "protection/ZORDataProtectionChangeOperation.h"
 #include "protection/ZORDataProtectionManager.h"
-#include "store/DispatchFixture.h"
+#include "world/World.h"
 
 #include <algorithm>
-#include <atomic>
+#include <condition_variable>
 #include <fcntl.h>
+#include <filesystem>
 #include <gtest/gtest.h>
 #include <mutex>
 #include <poll.h>
 #include <sys/fanotify.h>
 #include <sys/file.h>
 #include <sys/stat.h>
-#include <sys/xattr.h>
-#include <thread>
 #include <unistd.h>
 
 namespace zor::test {
 namespace {
 
+using support::DiskCall;
+using support::FaultSpan;
 using support::hasLine;
 using Request = ZORDataProtectionManager::Request;
 
 constexpr const char* function = "setDataProtectionOnDataContainerForUser";
+constexpr std::chrono::seconds patience(5);
 constexpr const char* perform = "performChangeOperation";
-constexpr const char* key = "com.veltra.Brevance.ContentProtectionClass";
+const std::string key = "com.veltra.Brevance.ContentProtectionClass";
+const std::string identifier = "com.example.app";
+const std::string assertionFile = "run/zorvane/assertions/com.example.app";
 
 /// What a completion was told, in the order of the calls.
 class Answers {
@@ -36,20 +40,18 @@ public:
         return [this](ErrorCode code) {
             const std::lock_guard held(mutex_);
             codes_.push_back(static_cast<std::uint64_t>(code));
+            told_.notify_all();
         };
     }
-    std::vector<std::uint64_t> codes() {
-        const std::lock_guard held(mutex_);
+    std::vector<std::uint64_t> codes(std::chrono::seconds wait = std::chrono::seconds(0)) {
+        std::unique_lock held(mutex_);
+        told_.wait_for(held, wait, [this] { return !codes_.empty(); });
         return codes_;
-    }
-    std::vector<std::uint64_t> wait() {
-        for (int i = 0; i < 5000 && codes().empty(); ++i)
-            std::this_thread::sleep_for(std::chrono::milliseconds(1));
-        return codes();
     }
 
 private:
     std::mutex mutex_;
+    std::condition_variable told_;
     std::vector<std::uint64_t> codes_;
 };
 
@@ -57,25 +59,22 @@ class Protection : public testing::Test {
 protected:
     Protection() : world({.logLevel = logLevelDebug}) {
         world.load();
-        container = make("com.example.app");
-        path = container.path.substr(world.path().size() + 1);
-        world.log.take();
+        useContainer();
     }
     ~Protection() override {
         if (suspended)
             world.linux().roles().lockStateQueue.resume();
     }
-    FoundContainer make(const std::string& identifier, bool transient = false) {
-        return world.daemonsClient()
-            .createOrLookupContainerForUser(mobile, &identifier, ContainerClass::dataApplication,
-                                            {.createIfNecessary = true, .transient = transient})
-            .value();
+    void useContainer() {
+        container = world.make(identifier);
+        path = world.relative(container.path) + "/";
+        world.log.take();
     }
     ZORDataProtectionManager& manager() { return world.services().store().dataProtection; }
     static Request to(int protectionClass) {
         return {.userId = mobile,
-                .identifier = "com.example.app",
-                .containerClass = ContainerClass::dataApplication,
+                .identifier = identifier,
+                .containerClass = application,
                 .dataProtectionClass = protectionClass};
     }
     std::uint64_t change(const Request& request) {
@@ -96,91 +95,87 @@ protected:
         world.linux().roles().lockStateQueue.resume();
         suspended = false;
     }
-    int classOf(const std::string& relative) {
-        const platform::FileDescriptor file(
-            ::open(world.path(path + "/" + relative).c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
-        return world.protection().classOf(file.get()).value_or(-1);
+    [[nodiscard]] platform::FileDescriptor open(const std::string& relative) const {
+        return platform::FileDescriptor(
+            ::open(world.path(relative).c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
     }
-    void put(const std::string& relative, int protectionClass) {
-        world.write(path + "/" + relative, "x");
-        const platform::FileDescriptor file(::open(world.path(path + "/" + relative).c_str(), O_RDONLY | O_CLOEXEC));
-        ASSERT_EQ(world.protection().setClass(file.get(), protectionClass), 0);
+    int classOf(const std::string& relative) { return world.protection().classOf(open(relative).get()).value_or(-1); }
+    void put(const std::string& file, int protectionClass) {
+        world.write(path + file, "x");
+        ASSERT_EQ(world.protection().setClass(open(path + file).get(), protectionClass), 0);
     }
     void record(int protectionClass) {
         const plist::Value value(protectionClass);
-        const std::string name = key;
-        ASSERT_TRUE(world.daemonsClient().setInfoValue(&value, &name, address(), UseLocking::yes));
+        ASSERT_TRUE(world.daemonsClient().setInfoValue(&value, &key, address(), UseLocking::yes));
     }
     std::optional<std::int64_t> recorded() {
-        const std::string name = key;
-        const auto value = world.daemonsClient().infoValueForKey(&name, address(), UseLocking::yes);
+        const auto value = world.daemonsClient().infoValueForKey(&key, address(), UseLocking::yes);
         return value ? value->asSigned() : std::nullopt;
     }
     [[nodiscard]] ZORClientConnection::ContainerAddress address() const {
-        return {.userId = mobile,
-                .uuid = container.uuid,
-                .identifier = "com.example.app",
-                .containerClass = ContainerClass::dataApplication};
+        return {.userId = mobile, .uuid = container.uuid, .identifier = identifier, .containerClass = application};
     }
-    [[nodiscard]] std::string assertionFile() const { return "run/zorvane/assertions/com.example.app"; }
 
     World world;
     FoundContainer container;
-    std::string path; // relative to the root
+    std::string path; // relative to the root, with a slash
     bool suspended = false;
 };
 
-// Goal: every request is judged in its order, with its code and words, and one that is refused or has nothing to do
-// touches nothing. Method: a table of requests.
+// Goal: every request is judged in its order, and a refused one touches nothing. Method: a table of requests.
 TEST_F(Protection, Requests) {
-    using Class = ContainerClass;
     struct Row {
         const char* name;
         Request request;
         std::uint64_t code;
         const char* message;
     };
-    const auto with = [](Request request, auto&& edit) {
-        edit(request);
+    const auto ofClass = [](ContainerClass containerClass) {
+        Request request = to(1);
+        request.containerClass = containerClass;
+        return request;
+    };
+    const auto named = [](std::optional<std::string> name) {
+        Request request = to(1);
+        request.identifier = std::move(name);
+        return request;
+    };
+    const auto foreign = [](int protectionClass) {
+        Request request = to(protectionClass);
+        request.isSecondOrThirdPartyApp = true;
         return request;
     };
     const Row rows[] = {
-        {"no identifier", with(to(1), [](Request& r) { r.identifier.reset(); }), 11,
-         "Can't act on an invalid object: userId: 501, ID: (null), class: 2"},
-        {"a bundle", with(to(1), [](Request& r) { r.containerClass = Class::bundleApplication; }), 11,
+        {"no identifier", named({}), 11, "Can't act on an invalid object: userId: 501, ID: (null), class: 2"},
+        {"a bundle", ofClass(ContainerClass::bundleApplication), 11,
          "Can't act on an invalid object: userId: 501, ID: com.example.app, class: 1"},
-        {"system data", with(to(1), [](Request& r) { r.containerClass = Class::dataSystem; }), 11,
+        {"system data", ofClass(ContainerClass::dataSystem), 11,
          "Can't act on an invalid object: userId: 501, ID: com.example.app, class: 12"},
-        {"unknown", with(to(1), [](Request& r) { r.identifier = "nobody"; }), 21,
-         "No Container with userId: 501, identifier: nobody, Class: 2 "},
+        {"unknown", named("nobody"), 21, "No Container with userId: 501, identifier: nobody, Class: 2 "},
         {"the class it has", to(3), 1, nullptr},
         {"never allowed", to(2), 38, "Data protection class 2 is not allowed"},
-        {"never allowed to others", with(to(2), [](Request& r) { r.isSecondOrThirdPartyApp = true; }), 38,
-         "Data protection class 2 is not allowed"},
-        {"too high for others", with(to(5), [](Request& r) { r.isSecondOrThirdPartyApp = true; }), 38,
-         "Data protection class 5 is invalid for 2nd and 3rd party apps"},
-        {"negative for others", with(to(-1), [](Request& r) { r.isSecondOrThirdPartyApp = true; }), 38,
-         "Data protection class -1 is invalid for 2nd and 3rd party apps"},
+        {"never allowed to others", foreign(2), 38, "Data protection class 2 is not allowed"},
+        {"too high for others", foreign(5), 38, "Data protection class 5 is invalid for 2nd and 3rd party apps"},
+        {"negative for others", foreign(-1), 38, "Data protection class -1 is invalid for 2nd and 3rd party apps"},
     };
     put("Documents/file", 1);
     for (const Row& row : rows) {
         SCOPED_TRACE(row.name);
         world.log.take();
         EXPECT_EQ(change(row.request), row.code);
-        const auto said = world.log.take(3, function);
+        const auto said = world.complaints(function);
         ASSERT_EQ(said.size(), row.message ? 1U : 0U);
-        EXPECT_TRUE(!row.message || support::withoutSourceLine(said[0]).starts_with(row.message)) << said[0];
+        EXPECT_TRUE(!row.message || said[0].starts_with(row.message)) << said[0];
         EXPECT_FALSE(recorded());
-        EXPECT_EQ(classOf("Documents/file"), 1);
+        EXPECT_EQ(classOf(path + "Documents/file"), 1);
     }
     record(7);
-    EXPECT_EQ(change(with(to(7), [](Request& r) { r.isSecondOrThirdPartyApp = true; })), 1U); // equality comes first
+    EXPECT_EQ(change(foreign(7)), 1U); // equality comes first
     EXPECT_EQ(change(to(5)), 1U);
     EXPECT_EQ(recorded(), 5);
 }
 
-// Goal: directories and files get exactly the classes that the change's kind says. Method: a table of recorded class,
-// requested class and file, and what each has afterwards.
+// Goal: exactly the classes that the change's kind says. Method: recorded and requested class, files before and after.
 TEST_F(Protection, WhatIsSet) {
     struct Row {
         std::optional<int> recorded;
@@ -202,19 +197,20 @@ TEST_F(Protection, WhatIsSet) {
         for (std::size_t i = 0; i < row.files.size(); ++i)
             put("Library/Caches/" + std::to_string(i), row.files[i].first);
         put("outside the items", 4);
+        put("Tillwerk/file", 2);
         EXPECT_EQ(change(to(row.requested)), 1U);
-        for (const char* directory : {"Documents", "Library", "Library/Caches", "tmp"})
-            EXPECT_EQ(classOf(directory), row.directory) << directory;
+        for (const char* directory : {"Documents", "Library", "Library/Caches", "tmp", "Tillwerk"})
+            EXPECT_EQ(classOf(path + directory), row.directory) << directory;
         for (std::size_t i = 0; i < row.files.size(); ++i)
-            EXPECT_EQ(classOf("Library/Caches/" + std::to_string(i)), row.files[i].second) << i;
-        EXPECT_EQ(classOf("outside the items"), 4);
+            EXPECT_EQ(classOf(path + "Library/Caches/" + std::to_string(i)), row.files[i].second) << i;
+        EXPECT_EQ(classOf(path + "outside the items"), 4);
         EXPECT_EQ(recorded(), row.requested);
         EXPECT_TRUE(manager().pending().empty());
     }
 }
 
-// Goal: a locked device answers 61, or is waited for; the assertion is there from the first retry to the end, and a
-// second lock during the retry makes another. Method: lock, ask, unlock by hand, with a file that brings the lock back.
+// Goal: a locked device answers 61, or is waited for under an assertion, through a second lock too.
+// Method: lock, ask, unlock by hand.
 TEST_F(Protection, WaitsForTheUnlock) {
     put("Documents/file", 4);
     lock();
@@ -230,66 +226,59 @@ TEST_F(Protection, WaitsForTheUnlock) {
     EXPECT_TRUE(answers.codes().empty());
     ASSERT_EQ(manager().pending().size(), 1U);
     EXPECT_EQ(manager().pending()[0].dataProtectionClass, 1);
-    EXPECT_FALSE(world.exists(assertionFile()));
+    EXPECT_FALSE(world.exists(assertionFile));
     EXPECT_EQ(world.services().platform().transactions.count(), 1U);
     // Unlocked and at once locked again: the queue runs and finds the device locked.
     world.linux().roles().lockStateQueue.resume();
-    for (int i = 0; i < 2000 && !world.exists(assertionFile()); ++i)
+    for (int i = 0; i < 2000 && !world.exists(assertionFile); ++i)
         std::this_thread::sleep_for(std::chrono::milliseconds(1));
     std::this_thread::sleep_for(std::chrono::milliseconds(60)); // several retries
     EXPECT_TRUE(answers.codes().empty());
-    EXPECT_EQ(world.read(assertionFile()), "0");
-    const platform::FileDescriptor held(::open(world.path(assertionFile()).c_str(), O_RDONLY | O_CLOEXEC));
+    EXPECT_EQ(world.read(assertionFile), "0");
+    const auto held = open(assertionFile);
     EXPECT_NE(::flock(held.get(), LOCK_SH | LOCK_NB), 0);
     EXPECT_EQ(world.services().platform().assertions.held(), std::vector<std::string>{"com.example.app"});
     world.lockState.state = 0;
     suspended = false;
-    EXPECT_EQ(answers.wait(), std::vector<std::uint64_t>{1});
-    EXPECT_FALSE(world.exists(assertionFile()));
+    EXPECT_EQ(answers.codes(patience), std::vector<std::uint64_t>{1});
+    EXPECT_FALSE(world.exists(assertionFile));
     EXPECT_EQ(::flock(held.get(), LOCK_SH | LOCK_NB), 0);
-    EXPECT_EQ(classOf("Documents/file"), 1);
+    EXPECT_EQ(classOf(path + "Documents/file"), 1);
     EXPECT_EQ(recorded(), 1);
     EXPECT_TRUE(hasLine(world.log.take(), 5, perform,
                         "Retrying container protection update to 1 on next unlock for user: 501, id: com.example.app, "
                         "containerClass: 2"));
 }
 
-// Goal: a container that is moved, replaced or deleted while a change waits is not touched by it. Method: each of
-// them between the request and the unlock.
+// Goal: a container moved, replaced or deleted while a change waits is not touched. Method: each before the unlock.
 TEST_F(Protection, TheContainerChangesMeanwhile) {
     struct Row {
         const char* name;
         std::function<void()> meanwhile;
         std::uint64_t code;
     };
-    const std::string identifier = "com.example.app";
+    ZORClientConnection& client = world.daemonsClient();
     const Row rows[] = {
-        {"renamed", [&] { ASSERT_TRUE(world.daemonsClient().regenerateDirectoryUUIDForUser(address())); }, 10},
+        {"renamed", [&] { ASSERT_TRUE(client.regenerateDirectoryUUIDForUser(address())); }, 10},
         {"replaced",
          [&] {
-             const FoundContainer fresh = make(identifier, true);
-             ASSERT_TRUE(world.daemonsClient().replaceContainer({.oldUuid = container.uuid,
-                                                                 .newUuid = fresh.uuid,
-                                                                 .userIdOld = mobile,
-                                                                 .userIdNew = mobile,
-                                                                 .identifierOld = identifier,
-                                                                 .identifierNew = identifier,
-                                                                 .classOld = ContainerClass::dataApplication,
-                                                                 .classNew = ContainerClass::dataApplication},
-                                                                StartDeletionThread::no));
+             const FoundContainer fresh = world.make(identifier, application, asTransient);
+             ASSERT_TRUE(client.replaceContainer({.oldUuid = container.uuid,
+                                                  .newUuid = fresh.uuid,
+                                                  .userIdOld = mobile,
+                                                  .userIdNew = mobile,
+                                                  .identifierOld = identifier,
+                                                  .identifierNew = identifier,
+                                                  .classOld = application,
+                                                  .classNew = application},
+                                                 StartDeletionThread::no));
          },
          10},
-        {"deleted",
-         [&] {
-             ASSERT_TRUE(world.daemonsClient().deleteContainerForUser(mobile, &identifier,
-                                                                      ContainerClass::dataApplication, false));
-         },
-         21},
+        {"deleted", [&] { ASSERT_TRUE(client.deleteContainerForUser(mobile, &identifier, application, false)); }, 21},
     };
     for (const Row& row : rows) {
         SCOPED_TRACE(row.name);
-        container = make(identifier);
-        path = container.path.substr(world.path().size() + 1);
+        useContainer();
         lock();
         Request request = to(1);
         request.retryIfLocked = true;
@@ -297,84 +286,72 @@ TEST_F(Protection, TheContainerChangesMeanwhile) {
         manager().setDataProtectionOnDataContainerForUser(request, answers.completion());
         row.meanwhile();
         unlock();
-        EXPECT_EQ(answers.wait(), std::vector<std::uint64_t>{row.code});
+        EXPECT_EQ(answers.codes(patience), std::vector<std::uint64_t>{row.code});
         EXPECT_FALSE(recorded());
-        EXPECT_FALSE(world.exists(assertionFile()));
+        EXPECT_FALSE(world.exists(assertionFile));
     }
 }
 
 // Goal: nothing outside a container changes its class, whatever its owner puts in it or swaps while it is walked.
-// Method: links, a FIFO, hard links in and out of the container; then an owner that swaps a directory and a link to a
-// file outside for as long as changes run.
+// Method: links, a FIFO, hard links; then an owner that swaps a directory and a link while changes run.
 TEST_F(Protection, HostileOwner) {
+    namespace files = std::filesystem;
+    const files::path documents = container.path + "/Documents";
+    const files::path outside = world.path("etc/outside");
     world.write("etc/outside/file", "x");
-    const auto outside = [&] {
-        const platform::FileDescriptor file(::open(world.path("etc/outside/file").c_str(), O_RDONLY | O_CLOEXEC));
-        return world.protection().classOf(file.get()).value_or(-1);
-    };
-    const std::string documents = world.path(path + "/Documents");
-    ASSERT_EQ(::symlink(world.path("etc/outside").c_str(), (documents + "/link").c_str()), 0);
-    ASSERT_EQ(::mkfifo((documents + "/fifo").c_str(), 0666), 0);
-    ASSERT_EQ(::link(world.path("etc/outside/file").c_str(), (documents + "/hard").c_str()), 0);
+    files::create_directory_symlink(outside, documents / "link");
+    files::create_hard_link(outside / "file", documents / "hard");
+    ASSERT_EQ(::mkfifo((documents / "fifo").c_str(), 0666), 0);
     put("Documents/one", 3);
-    ASSERT_EQ(::link((documents + "/one").c_str(), world.path(path + "/Library/two").c_str()), 0);
+    files::create_hard_link(documents / "one", container.path + "/Library/two");
     if (::geteuid() == 0) { // else all files are the owner's own
-        ASSERT_EQ(::chown((documents + "/one").c_str(), mobile, mobile), 0);
+        ASSERT_EQ(::chown((documents / "one").c_str(), mobile, mobile), 0);
         // Between the two directories the owner moves another's file on, so that its one name is met twice.
         world.disk().arm({.filter = [&](const auto&) {
-            ::rename((documents + "/hard").c_str(), world.path(path + "/Library/hard").c_str());
+            (void)::rename((documents / "hard").c_str(), (container.path + "/Library/hard").c_str());
             return false;
         }});
     }
     EXPECT_EQ(change(to(1)), 1U);
     world.disk().disarm();
-    EXPECT_EQ(outside(), 3);
-    EXPECT_EQ(classOf("Documents/one"), 1); // all its names are in the container
-    ASSERT_EQ(::rename((documents + "/link").c_str(), (documents + "/other").c_str()), 0);
-    ASSERT_EQ(::rmdir(world.path(path + "/tmp").c_str()), 0);
-    std::atomic<bool> stop{false};
+    EXPECT_EQ(classOf("etc/outside/file"), 3);
+    EXPECT_EQ(classOf(path + "Documents/one"), 1); // all its names are in the container
+    files::remove(container.path + "/tmp");
     put("Documents/swapped/file", 3);
-    std::thread owner([&] {
-        while (!stop)
-            (void)::renameat2(AT_FDCWD, (documents + "/other").c_str(), AT_FDCWD, (documents + "/swapped").c_str(),
+    std::jthread owner([&](const std::stop_token& stop) {
+        while (!stop.stop_requested())
+            (void)::renameat2(AT_FDCWD, (documents / "link").c_str(), AT_FDCWD, (documents / "swapped").c_str(),
                               RENAME_EXCHANGE);
     });
     const int rounds = std::getenv("ZORVANE_TEST_LONG") ? 20'000 : 500;
     for (int i = 0; i < rounds; ++i)
         EXPECT_EQ(change(to(i % 2 == 0 ? 3 : 1)), 1U);
-    stop = true;
+    owner.request_stop();
     owner.join();
-    EXPECT_EQ(outside(), 3);
-    EXPECT_EQ(::access(world.path(path + "/tmp").c_str(), F_OK), -1); // an item that is missing is not made
+    EXPECT_EQ(classOf("etc/outside/file"), 3);
+    EXPECT_FALSE(world.exists(path + "tmp")); // an item that is missing is not made
 }
 
-// Goal: a set that the kernel refuses ends the change with its error and records nothing; one for a descriptor that
-// went bad is passed over. Method: the platform's classes replaced by the disk's failures.
+// Goal: a refused set ends the change unrecorded; a descriptor gone bad is passed over. Method: a failing disk.
 TEST_F(Protection, FailuresOfTheSystem) {
     put("Documents/file", 4);
+    const auto says = [&](const char* part) {
+        return std::ranges::any_of(world.log.take(),
+                                   [&](const auto& one) { return one.message.find(part) != std::string::npos; });
+    };
     for (const auto& [error, code, line] :
          {std::tuple(ENOSPC, std::uint64_t{ENOSPC}, "failed with error"), std::tuple(EPERM, std::uint64_t{EACCES}, ""),
           std::tuple(EBADF, std::uint64_t{1}, "Ignoring failure")}) {
-        world.disk().arm({.error = error, .span = support::FaultSpan::fromThenOn, .filter = [](const auto& call) {
-                              return call.call == support::DiskCall::setAttribute;
-                          }});
+        world.refuse(DiskCall::setAttribute, error, FaultSpan::fromThenOn);
         EXPECT_EQ(change(to(1)), code);
         world.disk().disarm();
         EXPECT_EQ(recorded().has_value(), code == 1);
-        bool said = *line == '\0';
-        for (const auto& one : world.log.take())
-            said = said || one.message.find(line) != std::string::npos;
-        EXPECT_TRUE(said) << line;
+        EXPECT_TRUE(says(line)) << line;
     }
     // What is set and cannot be recorded is set.
-    world.disk().arm({.error = ENOSPC, .span = support::FaultSpan::fromThenOn, .filter = [](const auto& call) {
-                          return call.call == support::DiskCall::createFile;
-                      }});
+    world.refuse(DiskCall::createFile, ENOSPC, FaultSpan::fromThenOn);
     EXPECT_EQ(change(to(3)), 1U);
-    world.disk().disarm();
-    const auto said = world.log.take();
-    EXPECT_TRUE(std::ranges::any_of(
-        said, [](const auto& one) { return one.message.starts_with("Failed to set protection class info for "); }));
+    EXPECT_TRUE(says("Failed to set protection class info for "));
 }
 
 /// Refuses every open of a file or directory, as one whom root lets watch it may.
@@ -406,16 +383,17 @@ private:
     std::jthread answering_;
 };
 
-// Goal: an open that somebody forbids is the change's error; taken for a lock it would be tried again for ever. Method:
-// a listener that refuses the opens of the container, then of a file in it.
+// Goal: a forbidden open is the change's error; taken for a lock it would be tried again for ever. Method: a listener
+// that refuses the opens of the container, then of a file in it.
 TEST_F(Protection, AForbiddenOpenIsNoLock) {
+    const std::string& root = container.path;
+    const std::string file = root + "/Documents/file";
     put("Documents/file", 4);
     Request request = to(1);
     request.retryIfLocked = true;
-    const std::string root = world.path(path);
     for (const auto& [refused, line] :
          {std::pair(root, "fts_open failed for [\"" + root + "/Documents\", \"" + root + "/Library\", "),
-          std::pair(root + "/Documents/file", "Failed to open " + root + "/Documents/file : Permission denied")}) {
+          std::pair(file, "Failed to open " + file + " : Permission denied")}) {
         SCOPED_TRACE(refused);
         Answers answers;
         {
@@ -423,12 +401,12 @@ TEST_F(Protection, AForbiddenOpenIsNoLock) {
             if (!refusal.works())
                 GTEST_SKIP() << "skipped: needs root, and a kernel that lets an open be refused";
             manager().setDataProtectionOnDataContainerForUser(request, answers.completion());
-            EXPECT_EQ(answers.wait(), std::vector<std::uint64_t>{EACCES});
+            EXPECT_EQ(answers.codes(patience), std::vector<std::uint64_t>{EACCES});
         }
-        (void)answers.wait();
-        EXPECT_TRUE(std::ranges::any_of(world.log.take(), [&](const auto& one) {
-            return one.function == perform && one.message.find(line) != std::string::npos;
-        }));
+        (void)answers.codes(patience); // one that was taken for a lock ends now
+        const auto said = world.log.take(5, perform);
+        ASSERT_EQ(said.size(), 1U);
+        EXPECT_NE(said[0].find(line), std::string::npos) << said[0];
     }
 }
 
@@ -439,8 +417,8 @@ public:
     void resume() override {}
 };
 
-// Goal: what is thrown around a pass ends the change with 40, as what is thrown in it does, and not the daemon. Method:
-// a queue that gets no thread for the retry, and a retry whose start finds no memory.
+// Goal: what is thrown around a pass ends the change with 40, as in one, and not the daemon. Method: a queue that gets
+// no thread for the retry, and a retry whose start finds no memory.
 TEST_F(Protection, ExceptionsAroundAPass) {
     put("Documents/file", 4);
     lock();
@@ -454,48 +432,27 @@ TEST_F(Protection, ExceptionsAroundAPass) {
     EXPECT_TRUE(manager().pending().empty());
 
     using Operation = ZORDataProtectionChangeOperation;
-    const auto record =
-        world.services().cache().containerForUser(mobile, ContainerClass::dataApplication, &*request.identifier, false);
-    ASSERT_TRUE(record);
-    const auto operation = std::make_shared<Operation>(world.services().store(), *record, 1,
+    const auto metadata = world.services().cache().containerForUser(mobile, application, &identifier, false);
+    ASSERT_TRUE(metadata);
+    const auto operation = std::make_shared<Operation>(world.services().store(), *metadata, 1,
                                                        Operation::RetryIfLocked::yes, protectionChange::directories);
     Answers answers;
     operation->setRetryStartBlock([] { throw std::bad_alloc(); });
-    operation->setCompletionBlock([completion = answers.completion()](bool, const std::optional<ZORError>& error) {
-        completion(error ? error->replyCode() : ErrorCode::success);
+    operation->setCompletionBlock([told = answers.completion()](bool, const std::optional<ZORError>& error) {
+        told(error ? error->replyCode() : ErrorCode::success);
     });
     operation->performChangeOperation();
     unlock();
-    EXPECT_EQ(answers.wait(), std::vector<std::uint64_t>{40});
-}
-
-// Goal: the reply of command 19 comes exactly once, at once for what is judged at once, and with the code of the
-// change; only the low 32 bits of a class count. Method: messages through the dispatcher.
-TEST_F(Dispatch, ProtectionReplies) {
-    as(grant("com.example", everything));
-    const std::string identifier = "com.example.app";
-    ASSERT_TRUE(world.daemonsClient().createOrLookupContainerForUser(
-        mobile, &identifier, ContainerClass::dataApplication, {.createIfNecessary = true}));
-    const auto message = [&](std::int64_t protectionClass, std::uint64_t userId = mobile) {
-        return plist::Dictionary{
-            {"Command", std::uint64_t{19}}, {"ContainerClass", std::uint64_t{2}},     {"UserID", userId},
-            {"Identifier", identifier},     {"DataProtectionClass", protectionClass}, {"IsThirdParty", true}};
-    };
-    EXPECT_EQ(errorOf(request(message(std::int64_t{1} << 32 | 1))), 1U);
+    EXPECT_EQ(answers.codes(patience), std::vector<std::uint64_t>{40});
 }
 
 /// A service that grants, refuses, or has nothing.
 class FakeAssertions final : public platform::TerminationAssertionService {
 public:
-    class Handle final : public Assertion {
-    public:
-        explicit Handle(int& given) : given_(given) { ++given_; }
-        ~Handle() override { --given_; }
-        Handle(const Handle&) = delete;
-        Handle& operator=(const Handle&) = delete;
-
-    private:
-        int& given_;
+    struct Handle final : Assertion {
+        explicit Handle(int& number) : given(number) { ++given; }
+        ~Handle() override { --given; }
+        int& given;
     };
     std::unique_ptr<Assertion> acquire(std::string_view, platform::TerminationReason,
                                        AcquisitionHandler done) override {
@@ -511,8 +468,7 @@ public:
     std::thread answering;
 };
 
-// Goal: an assertion is held from its granting to its invalidation, and none is left behind by a refusal; an unknown
-// reason ends the process. Method: a service that answers from a thread of its own.
+// Goal: held from granting to invalidation, none left by a refusal. Method: a service that answers from a thread.
 TEST(TerminationAssertion, GrantedRefusedOrNone) {
     support::RecordingLog sink(5);
     const Log log(sink);
@@ -536,25 +492,24 @@ TEST(TerminationAssertion, GrantedRefusedOrNone) {
     EXPECT_DEATH((void)ZORApplicationTerminationAssertion::initWithBundleIdentifier(log, service, "a", 2), "");
 }
 
-// Goal: assertions of one application share its file, and the last takes it away; what a killed daemon left is taken
-// over. Method: the service on a root of its own.
+// Goal: assertions of one application share its file; a killed daemon's is taken over. Method: the real service.
 TEST(TerminationAssertion, Files) {
     World world;
-    world.write("run/zorvane/assertions/a%2Fb", "1"); // left unlocked
-    auto& service = world.linux().roles().assertions;
-    const auto ask = [&](std::string_view identifier) {
-        return service.acquire(identifier, platform::TerminationReason::critical,
-                               [](const auto& error) { EXPECT_FALSE(error); });
+    const std::string file = "run/zorvane/assertions/a%2Fb";
+    world.write(file, "1"); // left unlocked
+    const auto ask = [&](std::string_view name) {
+        return world.linux().roles().assertions.acquire(name, platform::TerminationReason::critical,
+                                                        [](const auto& error) { EXPECT_FALSE(error); });
     };
     auto first = ask("a/b");
     auto second = ask("a/b");
     ASSERT_TRUE(first && second);
-    EXPECT_EQ(world.read("run/zorvane/assertions/a%2Fb"), "255");
-    EXPECT_EQ(world.item("run/zorvane/assertions/a%2Fb").substr(0, 9), "file 0600");
+    EXPECT_EQ(world.read(file), "255");
+    EXPECT_TRUE(world.item(file).starts_with("file 0600"));
     first.reset();
-    EXPECT_TRUE(world.exists("run/zorvane/assertions/a%2Fb"));
+    EXPECT_TRUE(world.exists(file));
     second.reset();
-    EXPECT_FALSE(world.exists("run/zorvane/assertions/a%2Fb"));
+    EXPECT_FALSE(world.exists(file));
     EXPECT_FALSE(ask(std::string(256, 'a')));
 }
 

@@ -14,15 +14,13 @@ namespace {
 using support::hasLine;
 using support::LogLine;
 
-const std::string applications = std::string(mobileContainers) + "/Data/Application";
 const std::string shared = sharedPath;
 constexpr const char* goodUuid = "11111111-0000-4000-8000-000000000000";
 constexpr const char* lowerUuid = "abcdef00-0000-4000-8000-00000000000a";
 constexpr const char* bareUuid = "22222222-0000-4000-8000-000000000000";
 constexpr const char* cleanup = "_cleanupOrphanedDataForUser";
 
-// Goal: each entry of a class directory is kept or goes by its name and its metadata file alone. Method: a table over
-// names, files and classes, judged after one boot.
+// Goal: an entry is kept or goes by its name and metadata file alone. Method: a table judged after one boot.
 TEST(Setup, Orphans) {
     World world;
     world.write(
@@ -39,6 +37,7 @@ TEST(Setup, Orphans) {
     };
     const std::string system = shared + "/Data/System";
     const std::string group = shared + "/Shared/SystemGroup";
+    const std::string secondsGroups = "private/var/second/Containers/Shared/AppGroup";
     const Row rows[] = {
         {applications, goodUuid, File::good, true},
         {applications, lowerUuid, File::good, true},
@@ -46,7 +45,7 @@ TEST(Setup, Orphans) {
         {applications, bareUuid, File::missing, false},
         {applications, "Junk", File::good, false},
         {applications, "com.veltra.settingsd", File::good, false},
-        {"private/var/second/Containers/Shared/AppGroup", bareUuid, File::missing, false},
+        {secondsGroups, bareUuid, File::missing, false},
         {shared + "/Bundle/Framework", goodUuid, File::good, true},
         {shared + "/Bundle/Framework", "fonts", File::good, false},
         {system, "com.veltra.settingsd", File::good, true},
@@ -66,8 +65,10 @@ TEST(Setup, Orphans) {
             world.write(path + "/" + names::metadataFile,
                         row.file == File::good ? binary(metadataOf(2, mobile, "a")) : "");
     }
-    world.makeDirectories(system + "/short-name-without-file");
-    world.makeDirectories(applications + "/.hidden");
+    const char* const fileNamed = "44444444-0000-4000-8000-000000000000";
+    world.write(applications + "/" + fileNamed, "a file with a good name");
+    for (const std::string& path : {system + "/short-name-without-file", applications + "/.hidden"})
+        world.makeDirectories(path);
     // What moves across file systems hide lies beside what is moved, and beside where it goes.
     const std::string parents[] = {applications,
                                    shared,
@@ -78,7 +79,6 @@ TEST(Setup, Orphans) {
                                    "private/var/brevad/Library/Caches"};
     for (const std::string& parent : parents)
         world.makeDirectories(parent + "/.zorvaned-copy-abcdef");
-    world.write(applications + "/" + "44444444-0000-4000-8000-000000000000", "a file with a good name");
     world.daemonsClient().rebootContainerManagerSetup();
     std::multiset<std::string> gone = {"short-name-without-file", "Temp", "Temp", "Temp", "com.veltra.zorvaned"};
     for (const std::string& parent : parents) {
@@ -91,58 +91,50 @@ TEST(Setup, Orphans) {
             gone.insert(row.name);
     }
     EXPECT_TRUE(world.exists(applications + "/.hidden"));
-    EXPECT_TRUE(world.exists(applications + "/44444444-0000-4000-8000-000000000000"));
-    const auto dead = world.deathRow();
-    EXPECT_EQ(std::multiset<std::string>(dead.begin(), dead.end()), gone);
-    std::set<std::string> said;
-    for (const std::string& message : world.log.take(3, cleanup))
-        said.insert(message);
-    EXPECT_EQ(said,
-              (std::set<std::string>{
-                  "Deleting orphaned data missing a metadata file at: " + world.path(applications + "/" + bareUuid),
-                  "Deleting orphaned data missing a metadata file at: " +
-                      world.path(std::string("private/var/second/Containers/Shared/AppGroup/") + bareUuid)}));
+    EXPECT_TRUE(world.exists(applications + "/" + fileNamed));
+    const auto dying = world.deathRow();
+    EXPECT_EQ(std::multiset<std::string>(dying.begin(), dying.end()), gone);
+    const auto said = world.complaints(cleanup);
+    const std::string missing = "Deleting orphaned data missing a metadata file at: ";
+    EXPECT_EQ(std::set<std::string>(said.begin(), said.end()),
+              (std::set<std::string>{missing + world.path(applications + "/" + bareUuid),
+                                     missing + world.path(secondsGroups + "/" + bareUuid)}));
 }
 
 // Goal: a table of well-known names that cannot be read whole costs no container, and moves none; one that says less
-// than it did does. Method: what may be wrong with the file, a boot over a name that only the administrator's table can
-// give, then one with a good table that gives it no more.
+// than it did does. Method: bad files, a boot over a name that only the file can give; a boot with a good one.
 TEST(Setup, ATableThatCannotBeReadDeletesNothing) {
-    const std::string table = "etc/zorvane/wellknown.plist";
-    const std::string system = shared + "/Data/System/";
+    const std::string system = shared + "/Data/System";
+    const std::string other = "com.veltra.other";
+    const std::string settings = "com.veltra.settingsd";
     const auto naming = [](plist::Value names) { return binary(plist::Dictionary{{"System", std::move(names)}}); };
-    struct Row {
-        const char* name;
-        std::string bytes;
-        mode_t mode;
-    };
-    const Row rows[] = {
+    const std::tuple<const char*, std::string, mode_t> rows[] = {
         {"nonsense", "x", 0644},
-        {"writable by others", naming(plist::Dictionary{{"com.veltra.other", "short-name"}}), 0664},
-        {"a row", naming(plist::Dictionary{{"com.veltra.other", "short/name"}}), 0644},
-        {"no dictionary", naming(plist::Array{"com.veltra.other"}), 0644},
+        {"writable by others", naming(plist::Dictionary{{other, "short-name"}}), 0664},
+        {"a row", naming(plist::Dictionary{{other, "short/name"}}), 0644},
+        {"no dictionary", naming(plist::Array{other}), 0644},
     };
-    for (const Row& row : rows) {
-        SCOPED_TRACE(row.name);
+    for (const auto& [name, bytes, mode] : rows) {
+        SCOPED_TRACE(name);
         World world;
         const plist::Dictionary entitled{{std::string(entitlementKeys::systemContainer), true}};
-        ASSERT_TRUE(world.services().entitlements()._setEntitlementDictionaryValues(
-            {entitled, entitled}, {"com.veltra.other", "com.veltra.settingsd"}));
-        world.putContainer(system + "short-name", metadataOf(12, 499, "com.veltra.other", bareUuid));
-        world.putContainer(system + goodUuid, metadataOf(12, 499, "com.veltra.settingsd", goodUuid));
-        const auto boot = [&](const std::string& bytes, mode_t mode) {
-            world.write(table, bytes, mode);
+        ASSERT_TRUE(
+            world.services().entitlements()._setEntitlementDictionaryValues({entitled, entitled}, {other, settings}));
+        world.putContainer(system + "/short-name", metadataOf(12, 499, other, bareUuid));
+        world.putContainer(system + "/" + goodUuid, metadataOf(12, 499, settings, goodUuid));
+        const auto boot = [&](const std::string& table, mode_t tableMode) {
+            world.write("etc/zorvane/wellknown.plist", table, tableMode);
             world.restart();
             world.daemonsClient().rebootContainerManagerSetup();
         };
-        boot(row.bytes, row.mode);
-        EXPECT_EQ(world.names(shared + "/Data/System"), (std::vector<std::string>{goodUuid, "short-name"}));
-        EXPECT_EQ(world.log.take(3, cleanup),
-                  std::vector<std::string>{"Leaving " + world.path(system + "short-name") +
+        boot(bytes, mode);
+        EXPECT_EQ(world.names(system), (std::vector<std::string>{goodUuid, "short-name"}));
+        EXPECT_EQ(world.complaints(cleanup),
+                  std::vector<std::string>{"Leaving " + world.path(system + "/short-name") +
                                            ": the table of well-known containers, which may name it, could not be "
                                            "read"});
-        boot(naming(plist::Dictionary{{"com.veltra.settingsd", "settings"}}), 0644);
-        EXPECT_EQ(world.names(shared + "/Data/System"), std::vector<std::string>{"settings"});
+        boot(naming(plist::Dictionary{{settings, "settings"}}), 0644);
+        EXPECT_EQ(world.names(system), std::vector<std::string>{"settings"});
     }
 }
 
@@ -152,66 +144,56 @@ TEST(Setup, AnInternalBuildShowsWhatItDeletes) {
     world.write(applications + "/Junk/file", "x");
     world.load();
     world.log.take();
-    world.daemonsClient()._cleanupOrphanedDataForUser(mobile, ContainerClass::dataApplication);
-    const std::string junk = world.path(applications + "/Junk");
-    const auto said = world.log.take();
+    world.daemonsClient()._cleanupOrphanedDataForUser(mobile, application);
+    const std::string orphan = "\tOrphaned File: " + world.path(applications + "/Junk");
+    auto said = world.log.take();
     ASSERT_EQ(said.size(), 6U);
-    EXPECT_EQ(said[1], (LogLine{3, cleanup,
-                                "***INTERNAL BUILD REQUEST: If you see this, file a Tracklet in \"Zorvane | all\" with "
-                                "the following data:"}));
-    EXPECT_EQ(said[2], (LogLine{3, cleanup,
-                                "\tSomeone is writing invalid data to a container, which has now been orphaned. Here "
-                                "are the invalid files:"}));
-    EXPECT_EQ(said[3], (LogLine{3, "printDirectoryStructureAtURL", "\tOrphaned File: " + junk}));
-    EXPECT_EQ(said[4], (LogLine{3, "printDirectoryStructureAtURL", "\tOrphaned File: " + junk + "/file"}));
-    EXPECT_EQ(said[5], (LogLine{3, cleanup, "***END INTERNAL BUILD REQUEST"}));
+    said.erase(said.begin());
+    EXPECT_EQ(said, (std::vector<LogLine>{
+                        {3, cleanup,
+                         "***INTERNAL BUILD REQUEST: If you see this, file a Tracklet in \"Zorvane | all\" with "
+                         "the following data:"},
+                        {3, cleanup,
+                         "\tSomeone is writing invalid data to a container, which has now been orphaned. Here "
+                         "are the invalid files:"},
+                        {3, "printDirectoryStructureAtURL", orphan},
+                        {3, "printDirectoryStructureAtURL", orphan + "/file"},
+                        {3, cleanup, "***END INTERNAL BUILD REQUEST"}}));
     EXPECT_FALSE(world.exists(applications + "/Junk"));
 }
 
-// Goal: a boot throws all transient containers away and touches no user without a home; the launch empties staging and
-// death row, and what it found out while setting up is forgotten. Method: containers of every kind before, a boot, a
-// launch.
+// Goal: a boot throws transient containers away, a launch empties staging and death row and forgets what it found.
+// Method: containers of every kind before, a boot, a launch.
 TEST(Setup, BootAndLaunch) {
     World world;
     const std::string identifier = "com.example";
     const plist::Dictionary groups{{std::string(entitlementKeys::applicationGroups), plist::Array{identifier}},
                                    {std::string(entitlementKeys::systemContainer), true}};
     ASSERT_EQ(world.services().entitlements().processEntitlements(&groups, &identifier, nullptr), ErrorCode::success);
-    const auto make = [&](std::uint32_t userId, ContainerClass containerClass, bool transient) {
-        return world.daemonsClient()
-            .createOrLookupContainerForUser(userId, &identifier, containerClass,
-                                            {.createIfNecessary = true, .transient = transient})
-            .value();
-    };
-    std::vector<FoundContainer> live;
-    std::vector<FoundContainer> transient;
+    std::vector<std::string> live;
+    std::vector<std::string> transient;
     for (const auto& [userId, containerClass] :
-         {std::pair(mobile, ContainerClass::dataApplication), std::pair(second, ContainerClass::sharedAppGroup),
+         {std::pair(mobile, application), std::pair(second, ContainerClass::sharedAppGroup),
           std::pair(33U, ContainerClass::bundleApplication), std::pair(499U, ContainerClass::dataSystem)}) {
-        live.push_back(make(userId, containerClass, false));
-        transient.push_back(make(userId, containerClass, true));
+        live.push_back(world.make(identifier, containerClass, false, userId).path);
+        transient.push_back(world.make(identifier, containerClass, asTransient, userId).path);
     }
     world.restart();
-    world.makeDirectories(std::string(cachesPath) + "/Staging/half-made");
-    world.makeDirectories(std::string(cachesPath) + "/Dead/temp.abcdef/old");
+    world.makeDirectories(staging + "/half-made");
+    world.makeDirectories(dead + "/temp.abcdef/old");
     world.load();
-    (void)world.daemonsClient().containersForUser(mobile, ContainerClass::dataApplication, false);
+    (void)world.daemonsClient().containersForUser(mobile, application, false);
     EXPECT_EQ(world.services().cache().counts().classCaches, 1U);
     world.daemonsClient().rebootContainerManagerSetup();
-    EXPECT_EQ(world.names(std::string(cachesPath) + "/Dead").size(), 5U); // no pass was started
-    EXPECT_TRUE(world.exists(std::string(cachesPath) + "/Staging/half-made"));
-    world.daemonsClient().containerManagerSetup();
-    world.drainDeathRow();
-    EXPECT_TRUE(world.names(std::string(cachesPath) + "/Staging").empty());
-    EXPECT_TRUE(world.names(std::string(cachesPath) + "/Dead").empty());
+    EXPECT_EQ(world.names(dead).size(), 5U); // no pass was started
+    EXPECT_TRUE(world.exists(staging + "/half-made"));
+    world.launch();
+    EXPECT_TRUE(world.names(staging).empty());
+    EXPECT_TRUE(world.names(dead).empty());
     EXPECT_EQ(world.services().cache().counts().classCaches, 0U);
-    for (const FoundContainer& container : live)
-        EXPECT_EQ(::access(container.path.c_str(), F_OK), 0) << container.path;
-    for (const FoundContainer& container : transient)
-        EXPECT_NE(::access(container.path.c_str(), F_OK), 0) << container.path;
-    const auto again = world.daemonsClient().containersForUser(mobile, ContainerClass::dataApplication, true);
-    ASSERT_TRUE(again);
-    EXPECT_TRUE(again->empty());
+    EXPECT_TRUE(std::ranges::all_of(live, isThere));
+    EXPECT_TRUE(std::ranges::none_of(transient, isThere));
+    EXPECT_TRUE(world.daemonsClient().containersForUser(mobile, application, asTransient)->empty());
     EXPECT_FALSE(world.exists("private/var/nowhere"));
     for (const LogLine& line : world.log.take())
         EXPECT_FALSE(line.message.starts_with("Failed to delete")) << line;
@@ -220,22 +202,19 @@ TEST(Setup, BootAndLaunch) {
 // Goal: no failure stops a setup. Method: a disk on which no move succeeds; every step says so and the rest runs.
 TEST(Setup, GoesOnAfterFailures) {
     World world;
-    world.makeDirectories(std::string(cachesPath) + "/Staging/half-made");
+    world.makeDirectories(staging + "/half-made");
     world.load();
-    world.services().configuration().transientDirectory();
-    world.services().configuration().transientBundleDirectory();
-    world.services().configuration().getPerUserConfigurationForUserId(mobile)->transientDirectory();
-    world.services().configuration().deathrowDirectory();
+    ZORGlobalConfiguration& configuration = world.services().configuration();
+    configuration.transientDirectory();
+    configuration.transientBundleDirectory();
+    configuration.getPerUserConfigurationForUserId(mobile)->transientDirectory();
+    configuration.deathrowDirectory();
     world.log.take();
-    world.disk().arm({.error = EROFS, .span = support::FaultSpan::fromThenOn, .filter = [](const auto& call) {
-                          return call.call == support::DiskCall::rename;
-                      }});
-    world.daemonsClient().rebootContainerManagerSetup();
-    world.daemonsClient().containerManagerSetup();
-    world.drainDeathRow();
+    world.refuse(support::DiskCall::rename, EROFS, support::FaultSpan::fromThenOn);
+    world.boot();
     world.disk().disarm();
     std::vector<std::string> starts;
-    for (const std::string& message : world.log.take(3, "rebootContainerManagerSetup"))
+    for (const std::string& message : world.complaints("rebootContainerManagerSetup"))
         starts.push_back(message.substr(0, message.find(" : ")));
     EXPECT_EQ(starts, (std::vector<std::string>{
                           "Failed to migrate bundle containers to system location",
@@ -247,16 +226,14 @@ TEST(Setup, GoesOnAfterFailures) {
                           "Failed to delete per-user transient URL " +
                               world.path("private/var/second/Containers/Library/Caches/com.veltra.zorvaned/Temp"),
                       }));
-    EXPECT_TRUE(world.exists(std::string(cachesPath) + "/Staging/half-made"));
+    EXPECT_TRUE(world.exists(staging + "/half-made"));
     // Somebody's link in the place of a directory is neither followed nor emptied.
     world.makeDirectories("elsewhere/kept");
-    for (const std::string& place : {std::string(libraryPath) + "/Replace", applications}) {
+    for (const std::string& place : {journals, applications}) {
         std::filesystem::remove_all(world.path(place));
         ASSERT_EQ(::symlink(world.path("elsewhere").c_str(), world.path(place).c_str()), 0);
     }
-    world.daemonsClient().rebootContainerManagerSetup();
-    world.daemonsClient().containerManagerSetup();
-    world.drainDeathRow();
+    world.boot();
     EXPECT_TRUE(world.exists("elsewhere/kept"));
     std::set<std::string> unread;
     for (const LogLine& line : world.log.take())
@@ -265,8 +242,7 @@ TEST(Setup, GoesOnAfterFailures) {
     EXPECT_EQ(unread, (std::set<std::string>{cleanup, "_recoverFromReplaceOperationsWithError"}));
 }
 
-// Goal: a mapping is removed, then set; either failure is said and is the answer. Method: a table over class and
-// failure.
+// Goal: a mapping is removed, then set; either failure is said. Method: a table over class and failure.
 TEST(SandboxMapping, RemovesThenSets) {
     World world;
     world.load();
@@ -276,44 +252,39 @@ TEST(SandboxMapping, RemovesThenSets) {
     const auto map = [&](ContainerClass containerClass, const std::optional<FileURL>& to) {
         return world.daemonsClient()._setSandboxContainerMappingForUser(mobile, identifier, containerClass, to);
     };
+    constexpr const char* function = "_setSandboxContainerMappingForUser";
     for (const ContainerClass unsupported : {ContainerClass::bundleApplication, ContainerClass::dataSystem,
                                              ContainerClass::sharedSystemGroup, ContainerClass::undefined}) {
         EXPECT_FALSE(map(unsupported, url));
-        EXPECT_EQ(world.log.take(), (std::vector<LogLine>{{3, "_setSandboxContainerMappingForUser",
-                                                           "Unsupported class for setting sandbox container mapping: " +
-                                                               std::to_string(static_cast<int>(unsupported))}}));
+        EXPECT_EQ(world.complaints(function),
+                  (std::vector<std::string>{"Unsupported class for setting sandbox container mapping: " +
+                                            std::to_string(static_cast<int>(unsupported))}));
     }
-    struct Row {
-        ContainerClass containerClass;
-        const char* type;
-    };
-    for (const Row& row : {Row{ContainerClass::dataApplication, "1"}, Row{ContainerClass::sharedAppGroup, "2"}}) {
-        const std::string directory = std::string("run/zorvane/sandbox/501/") + row.type;
-        ASSERT_TRUE(map(row.containerClass, url));
+    for (const auto& [containerClass, type] :
+         {std::pair(application, "1"), std::pair(ContainerClass::sharedAppGroup, "2")}) {
+        const std::string directory = std::string("run/zorvane/sandbox/501/") + type;
+        ASSERT_TRUE(map(containerClass, url));
         const auto there = world.names(directory);
         ASSERT_EQ(there.size(), 1U);
-        char target[4096] = "";
-        ASSERT_GT(::readlink(world.path(directory + "/" + there[0]).c_str(), target, sizeof target - 1), 0);
-        EXPECT_EQ(target, url.path());
-        EXPECT_TRUE(map(row.containerClass, std::nullopt));
-        EXPECT_TRUE(map(row.containerClass, std::nullopt));
+        EXPECT_EQ(std::filesystem::read_symlink(world.path(directory + "/" + there[0])).string(), url.path());
+        for (int i = 0; i < 2; ++i)
+            EXPECT_TRUE(map(containerClass, std::nullopt));
         EXPECT_TRUE(world.names(directory).empty());
-        const std::string tail = std::string("class: ") + (row.type[0] == '1' ? "2" : "7") + ", path: ";
         world.sandbox.removeError = EIO;
-        EXPECT_FALSE(map(row.containerClass, url));
+        EXPECT_FALSE(map(containerClass, url));
         world.sandbox.removeError = 0;
         world.sandbox.setError = ENOSPC;
-        EXPECT_FALSE(map(row.containerClass, url));
+        EXPECT_FALSE(map(containerClass, url));
         world.sandbox.setError = 0;
-        EXPECT_EQ(
-            world.log.take(3, "_setSandboxContainerMappingForUser"),
-            (std::vector<std::string>{"Failed to remove mapping for user: 501, itemType: " + std::string(row.type) +
-                                          ", identifier: com.example/odd, " + tail + "(null) : 5",
-                                      "Failed to set mapping for user: 501, itemType: " + std::string(row.type) +
-                                          ", identifier com.example/odd, " + tail + url.path() + " : 28"}));
+        const std::string mapping = std::string("mapping for user: 501, itemType: ") + type + ", identifier";
+        const std::string tail =
+            "com.example/odd, class: " + std::to_string(static_cast<int>(containerClass)) + ", path: ";
+        EXPECT_EQ(world.complaints(function),
+                  (std::vector<std::string>{"Failed to remove " + mapping + ": " + tail + "(null) : 5",
+                                            "Failed to set " + mapping + " " + tail + url.path() + " : 28"}));
     }
     // A stop between the move of a container and its mapping leaves one that points to nothing; the launch removes it.
-    ASSERT_TRUE(map(ContainerClass::dataApplication, world.url("private/var/mobile/gone")));
+    ASSERT_TRUE(map(application, world.url("private/var/mobile/gone")));
     ASSERT_TRUE(map(ContainerClass::sharedAppGroup, url));
     world.daemonsClient().containerManagerSetup();
     EXPECT_TRUE(world.names("run/zorvane/sandbox/501/1").empty());

@@ -6,9 +6,9 @@
 #include "store/operations/ReplaceJournal.h"
 #include "world/World.h"
 
+#include <filesystem>
 #include <gtest/gtest.h>
 #include <new>
-#include <unistd.h>
 
 namespace zor::test {
 namespace {
@@ -19,13 +19,6 @@ class Shortage : public testing::Test {
 protected:
     Shortage() { world.load(); }
 
-    FoundContainer make(const std::string& identifier, ContainerClass containerClass) {
-        return world.daemonsClient()
-            .createOrLookupContainerForUser(isBundleClass(containerClass) ? 33 : mobile, &identifier, containerClass,
-                                            {.createIfNecessary = true})
-            .value();
-    }
-    [[nodiscard]] std::string relative(const std::string& path) const { return path.substr(world.path().size() + 1); }
     /// The daemon ended after the first of a replace's two moves.
     void stopAReplaceOf(const FoundContainer& old) {
         StoreServices& store = world.services().store();
@@ -40,53 +33,49 @@ protected:
             store.log, store.fileManager, ReplaceJournal::urlFor(store.configuration.replaceDirectory(), uuid)));
         ASSERT_TRUE(store.fileManager.moveItemAtURL(oldUrl, journal.stagingUrl));
     }
-    void launch() {
+    void relaunch() {
         world.restart();
-        world.load();
-        world.daemonsClient().containerManagerSetup();
-        world.drainDeathRow();
+        world.launch();
     }
 
     World world;
 };
 
-// Goal: a launch that cannot read the journals deletes nothing that they name. Method: a stopped replace, a launch in
-// which the Replace directory is something else or descriptors are few, then a launch as it should be.
+// Goal: a launch that cannot read the journals deletes nothing that they name. Method: a stopped replace, a launch with
+// few descriptors or something else in the journals' place, then a launch as it should be.
 TEST_F(Shortage, JournalsThatCannotBeReadKeepWhatTheyName) {
-    const FoundContainer old = make("old", ContainerClass::dataApplication);
-    const std::string content = relative(old.path) + "/content";
-    const std::string journals = std::string(libraryPath) + "/Replace";
+    const FoundContainer old = world.make("old");
+    const std::string content = world.relative(old.path) + "/content";
     world.write(content, "old");
     for (rlim_t left = 0; left <= descriptorsMax; ++left) {
         SCOPED_TRACE(left);
         stopAReplaceOf(old);
         if (left == descriptorsMax) {
-            ASSERT_EQ(::rename(world.path(journals).c_str(), world.path(journals + ".aside").c_str()), 0);
+            const std::string there = world.path(journals);
+            std::filesystem::rename(there, there + ".aside");
             world.write(journals, "no directory");
-            launch();
-            ASSERT_EQ(::unlink(world.path(journals).c_str()), 0);
-            ASSERT_EQ(::rename(world.path(journals + ".aside").c_str(), world.path(journals).c_str()), 0);
+            relaunch();
+            std::filesystem::remove(there);
+            std::filesystem::rename(there + ".aside", there);
         } else {
             world.restart();
             world.load();
             const FewDescriptors few(left);
             world.daemonsClient().containerManagerSetup();
         }
-        launch();
+        relaunch();
         ASSERT_EQ(world.read(content), "old");
     }
 }
 
-// Goal: a bundle's size that was measured in part is not kept as its size. Method: first measured with each number of
-// descriptors left, then with all.
+// Goal: a size that was measured in part is not kept. Method: each number of descriptors left, then all.
 TEST_F(Shortage, ASizeMeasuredInPartIsNotKept) {
     int inPart = 0;
     for (rlim_t left = 0; left < descriptorsMax; ++left) {
         SCOPED_TRACE(left);
-        const FoundContainer bundle = make("size" + std::to_string(left), ContainerClass::bundleApplication);
-        world.makeDirectories(relative(bundle.path) + "/a/b");
-        world.write(relative(bundle.path) + "/a/b/file", std::string(100'000, 'x'));
-        const ZORClientConnection::ContainerAddress address{.userId = 33,
+        const FoundContainer bundle = world.make("size" + std::to_string(left), ContainerClass::bundleApplication);
+        world.write(world.relative(bundle.path) + "/a/b/file", std::string(100'000, 'x'));
+        const ZORClientConnection::ContainerAddress address{.userId = bundle.record->uid(),
                                                             .uuid = bundle.uuid,
                                                             .identifier = bundle.record->identifier(),
                                                             .containerClass = ContainerClass::bundleApplication};
@@ -103,8 +92,7 @@ TEST_F(Shortage, ASizeMeasuredInPartIsNotKept) {
     EXPECT_GT(inPart, 1);
 }
 
-// Goal: what a client was told to have failed is saved when it asks again. Method: memory that is short while the map
-// is written, the same request, then a launch.
+// Goal: what a client was told to have failed is saved when it asks again. Method: a want of memory, then a launch.
 TEST_F(Shortage, AnEntitlementThatWasNotSavedIsSavedWhenAskedAgain) {
     const std::string identifier = "app";
     const plist::Dictionary entitlements{{"k", "v"}};

@@ -31,10 +31,13 @@ enum class DiskCall : std::uint8_t {
 
 const char* nameOf(DiskCall call);
 
-/// A call about to be made. `subject` is the name it acts on, "FROM -> TO" for two, or empty for one on a descriptor.
+/// A call about to be made.
 struct DiskCallInfo {
     DiskCall call = DiskCall::sync;
+    /// The name it acts on, "FROM -> TO" for two, or empty for one on a descriptor.
     std::string subject;
+    /// The directory of the (first) name, or the descriptor.
+    int fd = -1;
 
     [[nodiscard]] std::string describe() const;
 };

@@ -9,9 +9,8 @@
 // stack unwinds (destructors may not throw), returns -EIO.
 #pragma once
 
-#include "platform/Disk.h"
 #include "platform/Mutex.h"
-#include "support/DiskCall.h"
+#include "support/InterceptedDisk.h"
 
 #include <cerrno>
 #include <functional>
@@ -42,11 +41,11 @@ struct Fault {
     [[nodiscard]] std::string describe() const;
 };
 
-class FaultDisk : public platform::Disk {
+class FaultDisk final : public InterceptedDisk {
 public:
     static constexpr int exitStatus = 86;
 
-    explicit FaultDisk(platform::Disk& inner) : inner_(inner) {}
+    using InterceptedDisk::InterceptedDisk;
 
     void arm(const Fault& fault);
     void disarm();
@@ -54,31 +53,15 @@ public:
     [[nodiscard]] bool met() const;
     [[nodiscard]] DiskCallInfo metCall() const;
 
-    int makeDirectory(int directory, const char* name, mode_t mode) override;
-    int createFile(int directory, const char* name, mode_t mode) override;
-    int makeSymbolicLink(const char* target, int directory, const char* name) override;
-    int makeHardLink(int fromDirectory, const char* from, int toDirectory, const char* to) override;
-    int makeFifo(int directory, const char* name, mode_t mode) override;
-    int rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) override;
-    int unlinkFile(int directory, const char* name) override;
-    int removeDirectory(int directory, const char* name) override;
-    int changeMode(int fd, mode_t mode) override;
-    int changeOwner(int fd, uid_t uid, gid_t gid) override;
-    int setTimes(int fd, const timespec& access, const timespec& modification) override;
-    int setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) override;
-    int setInodeFlags(int fd, int flags) override;
     int write(int fd, std::span<const std::uint8_t> bytes) override;
-    int cloneData(int from, int to) override;
-    ssize_t copyData(int from, int to, std::size_t bytesMax) override;
-    int sync(int fd) override;
-    int syncFileSystem(int fd) override;
-    int orderData(int fd) override;
+
+protected:
+    ssize_t intercept(const DiskCallInfo& info, const Make& make) override;
 
 private:
     /// 0 to go on, the negative errno to return, or the end.
-    int pass(DiskCall call, std::string subject = {});
+    int faultOf(const DiskCallInfo& info);
 
-    platform::Disk& inner_;
     mutable platform::Mutex mutex_;
     Fault fault_ ZOR_GUARDED_BY(mutex_);
     bool armed_ ZOR_GUARDED_BY(mutex_) = false;

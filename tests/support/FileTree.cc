@@ -1,19 +1,16 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "support/FileTree.h"
 
-#include "platform/FileDescriptor.h"
+#include "support/Files.h"
 
 #include <algorithm>
-#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
-#include <dirent.h>
 #include <fcntl.h>
+#include <filesystem>
 #include <ftw.h>
 #include <functional>
-#include <memory>
 #include <sys/xattr.h>
-#include <system_error>
 #include <unistd.h>
 
 namespace zor::support {
@@ -22,24 +19,11 @@ using platform::FileDescriptor;
 
 namespace {
 
-[[noreturn]] void fail(const std::string& what) {
-    throw std::system_error(errno, std::generic_category(), what);
-}
-
-FileDescriptor openDirectory(int parent, const std::string& path) {
-    FileDescriptor fd(::openat(parent, path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-    if (!fd.valid())
-        fail("open directory " + path);
-    return fd;
-}
-
 Bytes readAll(int fd) {
     Bytes bytes;
     std::uint8_t buffer[16384];
     for (;;) {
-        const ssize_t count = ::read(fd, buffer, sizeof buffer);
-        if (count < 0)
-            fail("read");
+        const ssize_t count = checked(::read(fd, buffer, sizeof buffer), "read");
         if (count == 0)
             return bytes;
         bytes.insert(bytes.end(), buffer, buffer + count);
@@ -50,11 +34,9 @@ std::map<std::string, Bytes> readAttributes(int fd) {
     std::map<std::string, Bytes> attributes;
     char names[4096];
     const ssize_t length = ::flistxattr(fd, names, sizeof names);
-    if (length < 0) {
-        if (errno == EOPNOTSUPP)
-            return attributes;
-        fail("flistxattr");
-    }
+    if (length < 0 && errno == EOPNOTSUPP)
+        return attributes;
+    checked(length, "flistxattr");
     for (ssize_t at = 0; at < length;) {
         const std::string name(names + at);
         at += static_cast<ssize_t>(name.size()) + 1;
@@ -62,74 +44,47 @@ std::map<std::string, Bytes> readAttributes(int fd) {
         if (!name.starts_with("user.") && !name.starts_with("trusted."))
             continue;
         Bytes value(4096);
-        const ssize_t size = ::fgetxattr(fd, name.c_str(), value.data(), value.size());
-        if (size < 0)
-            fail("fgetxattr " + name);
+        const ssize_t size = checked(::fgetxattr(fd, name.c_str(), value.data(), value.size()), "fgetxattr " + name);
         value.resize(static_cast<std::size_t>(size));
         attributes.emplace(name, std::move(value));
     }
     return attributes;
 }
 
-std::vector<std::string> listNames(DIR* stream) {
-    std::vector<std::string> names;
-    errno = 0;
-    while (const dirent* entry = ::readdir(stream)) {
-        const std::string_view name = entry->d_name;
-        if (name != "." && name != "..")
-            names.emplace_back(name);
-    }
-    if (errno != 0)
-        fail("readdir");
-    std::sort(names.begin(), names.end());
-    return names;
-}
-
-Inode inodeOf(const struct stat& status) {
-    return {.mode = status.st_mode, .uid = status.st_uid, .gid = status.st_gid, .device = status.st_dev};
-}
-
 std::string joined(const std::string& path, const std::string& name) {
     return path.empty() ? name : path + "/" + name;
-}
-
-std::string hexadecimal(std::size_t value) {
-    char text[32];
-    std::snprintf(text, sizeof text, "%zx", value);
-    return text;
 }
 
 /// Contents are told apart by length and hash: enough for a comparison, short enough for a message.
 std::string digest(const Bytes& bytes) {
     const std::string_view text(reinterpret_cast<const char*>(bytes.data()), bytes.size());
-    return std::to_string(bytes.size()) + ":" + hexadecimal(std::hash<std::string_view>{}(text));
+    return std::to_string(bytes.size()) + ":" + std::to_string(std::hash<std::string_view>{}(text));
 }
 
 void materialiseItem(const Inode& inode, int parent, const std::string& path) {
-    FileDescriptor fd;
-    if (S_ISDIR(inode.mode)) {
-        if (::mkdirat(parent, path.c_str(), 0700) != 0)
-            fail("mkdir " + path);
-        fd = openDirectory(parent, path);
-    } else if (S_ISREG(inode.mode)) {
-        fd.reset(::openat(parent, path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
-        if (!fd.valid())
-            fail("create " + path);
-        if (::write(fd.get(), inode.content.data(), inode.content.size()) != static_cast<ssize_t>(inode.content.size()))
-            fail("write " + path);
-    } else if (S_ISLNK(inode.mode)) {
-        const std::string target(inode.content.begin(), inode.content.end());
-        if (::symlinkat(target.c_str(), parent, path.c_str()) != 0)
-            fail("symlink " + path);
-    } else if (::mknodat(parent, path.c_str(), inode.mode, 0) != 0) {
-        fail("mknod " + path);
-    }
+    const std::string text(inode.content.begin(), inode.content.end());
+    if (S_ISDIR(inode.mode))
+        makeDirectory(parent, path, 0700);
+    else if (S_ISREG(inode.mode))
+        makeFile(parent, path, text, 0600);
+    else if (S_ISLNK(inode.mode))
+        makeLink(parent, path, text);
+    else
+        checked(::mknodat(parent, path.c_str(), inode.mode, 0), "mknod " + path);
     for (const auto& [name, value] : inode.attributes) {
-        if (::fsetxattr(fd.get(), name.c_str(), value.data(), value.size(), 0) != 0)
-            fail("fsetxattr " + name + " of " + path);
+        const FileDescriptor fd(checked(::openat(parent, path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC), path));
+        checked(::fsetxattr(fd.get(), name.c_str(), value.data(), value.size(), 0),
+                "fsetxattr " + name + " of " + path);
     }
-    if (::geteuid() == 0 && ::fchownat(parent, path.c_str(), inode.uid, inode.gid, AT_SYMLINK_NOFOLLOW) != 0)
-        fail("chown " + path);
+    if (::geteuid() == 0)
+        checked(::fchownat(parent, path.c_str(), inode.uid, inode.gid, AT_SYMLINK_NOFOLLOW), "chown " + path);
+}
+
+/// Its status, itself where it is a link.
+struct stat statusOf(int directory, const std::string& name) {
+    struct stat status = {};
+    checked(::fstatat(directory, name.c_str(), &status, AT_SYMLINK_NOFOLLOW), "stat " + name);
+    return status;
 }
 
 } // namespace
@@ -201,20 +156,14 @@ bool FileTree::isTree() const {
 }
 
 Inode readInode(int directory, const char* name) {
-    struct stat status = {};
-    if (::fstatat(directory, name, &status, AT_SYMLINK_NOFOLLOW) != 0)
-        fail(std::string("stat ") + name);
-    Inode inode = inodeOf(status);
+    const struct stat status = statusOf(directory, name);
+    Inode inode{.mode = status.st_mode, .uid = status.st_uid, .gid = status.st_gid, .device = status.st_dev};
     if (S_ISLNK(status.st_mode)) {
         char target[4096];
-        const ssize_t length = ::readlinkat(directory, name, target, sizeof target);
-        if (length < 0)
-            fail(std::string("readlink ") + name);
-        inode.content.assign(target, target + length);
+        inode.content.assign(target, target + checked(::readlinkat(directory, name, target, sizeof target), name));
     } else if (S_ISREG(status.st_mode) || S_ISDIR(status.st_mode)) {
-        const FileDescriptor fd(::openat(directory, name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
-        if (!fd.valid())
-            fail(std::string("open ") + name);
+        constexpr int flags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC;
+        const FileDescriptor fd(checked(::openat(directory, name, flags), name));
         inode.attributes = readAttributes(fd.get());
         if (S_ISREG(status.st_mode))
             inode.content = readAll(fd.get());
@@ -224,32 +173,27 @@ Inode readInode(int directory, const char* name) {
 
 FileTree readTree(const std::string& directory, const std::set<std::string>& excluded,
                   std::map<DeviceInode, InodeId>* known) {
-    const FileDescriptor root = openDirectory(AT_FDCWD, directory);
     FileTree tree;
     std::map<DeviceInode, InodeId> ids;
-    InodeId next = FileTree::rootId;
-    const auto add = [&](int parent, const std::string& name) {
-        struct stat status = {};
-        if (::fstatat(parent, name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0)
-            fail("stat " + name);
-        const auto [id, isNew] = ids.emplace(DeviceInode(status.st_dev, status.st_ino), next);
-        // A directory is opened once, below.
+    const auto add = [&](const std::string& path) {
+        const struct stat status = statusOf(AT_FDCWD, path);
+        const auto [id, isNew] = ids.emplace(DeviceInode(status.st_dev, status.st_ino), FileTree::rootId + ids.size());
         if (isNew)
-            tree.inodes.emplace(next++, S_ISDIR(status.st_mode) ? inodeOf(status) : readInode(parent, name.c_str()));
+            tree.inodes.emplace(id->second, readInode(AT_FDCWD, path.c_str()));
         return id->second;
     };
-    std::vector<std::pair<std::string, InodeId>> pending = {{"", add(root.get(), ".")}};
+    std::vector<std::pair<std::string, InodeId>> pending = {{"", add(directory)}};
     while (!pending.empty()) {
         const auto [path, id] = pending.back();
         pending.pop_back();
-        FileDescriptor fd = openDirectory(root.get(), path.empty() ? "." : path);
-        tree.inodes.at(id).attributes = readAttributes(fd.get());
-        const std::unique_ptr<DIR, int (*)(DIR*)> stream(::fdopendir(fd.release()), ::closedir);
-        for (const std::string& name : listNames(stream.get())) {
+        std::set<std::string> names;
+        for (const auto& entry : std::filesystem::directory_iterator(joined(directory, path)))
+            names.insert(entry.path().filename().string());
+        for (const std::string& name : names) {
             const std::string itemPath = joined(path, name);
             if (excluded.contains(itemPath))
                 continue;
-            const InodeId child = add(::dirfd(stream.get()), name);
+            const InodeId child = add(joined(directory, itemPath));
             tree.inodes.at(id).entries.emplace(name, child);
             if (tree.inodes.at(child).isDirectory())
                 pending.emplace_back(itemPath, child);
@@ -261,7 +205,7 @@ FileTree readTree(const std::string& directory, const std::set<std::string>& exc
 }
 
 void materialise(const FileTree& tree, const std::string& directory) {
-    const FileDescriptor root = openDirectory(AT_FDCWD, directory);
+    const FileDescriptor root = openDirectory(directory);
     std::map<InodeId, std::string> made;
     std::vector<std::pair<std::string, InodeId>> pending = {{"", FileTree::rootId}};
     while (!pending.empty()) {
@@ -271,8 +215,7 @@ void materialise(const FileTree& tree, const std::string& directory) {
         if (id != FileTree::rootId) {
             const auto [first, isNew] = made.emplace(id, path);
             if (!isNew) {
-                if (::linkat(root.get(), first->second.c_str(), root.get(), path.c_str(), 0) != 0)
-                    fail("link " + path);
+                checked(::linkat(root.get(), first->second.c_str(), root.get(), path.c_str(), 0), "link " + path);
                 continue;
             }
             materialiseItem(inode, root.get(), path);
@@ -284,14 +227,13 @@ void materialise(const FileTree& tree, const std::string& directory) {
     made.emplace(FileTree::rootId, ".");
     for (const auto& [id, path] : made) {
         const Inode& inode = tree.inodes.at(id);
-        if (!S_ISLNK(inode.mode) && ::fchmodat(root.get(), path.c_str(), inode.mode & 07777, 0) != 0)
-            fail("chmod " + path);
+        if (!S_ISLNK(inode.mode))
+            checked(::fchmodat(root.get(), path.c_str(), inode.mode & 07777, 0), "chmod " + path);
     }
 }
 
 TemporaryDirectory::TemporaryDirectory(const std::string& parent) : path_(parent + "/zorvane-test.XXXXXX") {
-    if (::mkdtemp(path_.data()) == nullptr)
-        fail("mkdtemp in " + parent);
+    checked(::mkdtemp(path_.data()) == nullptr ? -1 : 0, "mkdtemp in " + parent);
 }
 
 TemporaryDirectory::~TemporaryDirectory() {

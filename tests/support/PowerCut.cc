@@ -95,12 +95,16 @@ std::vector<PowerCut::Prefixes> PowerCut::prefixesToTry(std::size_t done, std::m
     return tried;
 }
 
-bool PowerCut::dataIsSynced(std::size_t write, std::size_t done) const {
-    for (std::size_t s = write + 1; s < done; ++s) {
-        const LoggedOperation& operation = log_.operations[s];
-        const LoggedOperation& written = log_.operations[write];
-        if ((operation.call == DiskCall::syncFileSystem && operation.device == written.device) ||
-            (operation.call == DiskCall::sync && operation.inode == written.inode))
+bool PowerCut::isSynced(std::size_t index, std::size_t done) const {
+    const LoggedOperation& operation = log_.operations[index];
+    for (std::size_t s = index + 1; s < done; ++s) {
+        const LoggedOperation& sync = log_.operations[s];
+        if (sync.call == DiskCall::syncFileSystem && sync.device == operation.device)
+            return true;
+        const bool reaches = operation.changesNames()
+                                 ? sync.inode == operation.directory || sync.inode == operation.toDirectory
+                                 : sync.inode == operation.inode;
+        if (sync.call == DiskCall::sync && reaches)
             return true;
     }
     return false;
@@ -115,19 +119,6 @@ bool PowerCut::dataIsOrdered(std::size_t write, std::size_t prefix) const {
     return false;
 }
 
-bool PowerCut::isCertain(std::size_t index, std::size_t done) const {
-    const LoggedOperation& operation = log_.operations[index];
-    if (operation.writes() || operation.changesInode())
-        return dataIsSynced(index, done);
-    for (std::size_t s = index + 1; s < done; ++s) {
-        const LoggedOperation& sync = log_.operations[s];
-        if ((sync.call == DiskCall::syncFileSystem && sync.device == operation.device) ||
-            (sync.call == DiskCall::sync && (sync.inode == operation.directory || sync.inode == operation.toDirectory)))
-            return true;
-    }
-    return false;
-}
-
 void PowerCut::completeBackwards(std::vector<bool>& persisted) const {
     for (std::size_t i = persisted.size(); i-- > 0;) {
         if (!persisted[i])
@@ -135,6 +126,12 @@ void PowerCut::completeBackwards(std::vector<bool>& persisted) const {
         for (const std::size_t earlier : startedFrom_[i])
             persisted[earlier] = true;
     }
+}
+
+void PowerCut::decide(Choice& choice, std::size_t write, DataFate fate, std::mt19937_64& random) const {
+    const std::size_t length = random() % log_.operations[write].value.content.size();
+    choice.data[write] = fate;
+    choice.cutTo[write] = fate == DataFate::cut ? length : 0;
 }
 
 std::vector<PowerCut::Choice> PowerCut::orderedChoices(std::size_t done) const {
@@ -146,10 +143,9 @@ std::vector<PowerCut::Choice> PowerCut::orderedChoices(std::size_t done) const {
         for (std::size_t i = 0; i < done; ++i) {
             const std::size_t prefix = prefixes.at(log_.operations[i].device);
             choice.persisted[i] = i < prefix;
-            if (!log_.operations[i].writes() || dataIsSynced(i, done) || dataIsOrdered(i, prefix))
+            if (!log_.operations[i].writes() || isSynced(i, done) || dataIsOrdered(i, prefix))
                 continue;
-            choice.data[i] = fate();
-            choice.cutTo[i] = random() % log_.operations[i].value.content.size();
+            decide(choice, i, fate(), random);
         }
         choices.push_back(std::move(choice));
     };
@@ -165,7 +161,7 @@ std::vector<PowerCut::Choice> PowerCut::unorderedChoices(std::size_t done) const
     std::mt19937_64 random(options_.seed * 1'000'003 + done);
     std::vector<bool> certain(done);
     for (std::size_t i = 0; i < done; ++i)
-        certain[i] = isCertain(i, done);
+        certain[i] = isSynced(i, done);
     completeBackwards(certain);
     std::vector<std::size_t> uncertain;
     for (std::size_t i = 0; i < done; ++i) {
@@ -181,10 +177,8 @@ std::vector<PowerCut::Choice> PowerCut::unorderedChoices(std::size_t done) const
             choice.persisted[i] = isThere(i);
         completeBackwards(choice.persisted);
         for (const std::size_t i : uncertain) {
-            if (!log_.operations[i].writes() || choice.persisted[i])
-                continue;
-            choice.data[i] = lostFate();
-            choice.cutTo[i] = random() % log_.operations[i].value.content.size();
+            if (log_.operations[i].writes() && !choice.persisted[i])
+                decide(choice, i, lostFate(), random);
         }
         choices.push_back(std::move(choice));
     };
@@ -251,9 +245,12 @@ PowerCutState PowerCut::build(const Choice& choice, std::size_t done) const {
 
 std::vector<PowerCutState> PowerCut::statesAfter(std::size_t done) const {
     std::vector<PowerCutState> states;
+    std::set<Choice> tried;
     std::set<std::string> seen;
     const bool ordered = options_.model == DiskModel::orderedJournal;
     for (const Choice& choice : ordered ? orderedChoices(done) : unorderedChoices(done)) {
+        if (!tried.insert(choice).second)
+            continue;
         PowerCutState state = build(choice, done);
         // Directories moved around each other may come out of a choice in a way that no file system leaves them in.
         if (state.tree.isTree() && seen.insert(state.tree.describe()).second)

@@ -20,6 +20,7 @@
 
 #include "support/RecordingDisk.h"
 
+#include <compare>
 #include <functional>
 #include <random>
 
@@ -62,20 +63,22 @@ private:
         std::vector<bool> persisted;
         std::vector<DataFate> data;
         std::vector<std::size_t> cutTo;
+        auto operator<=>(const Choice&) const = default;
     };
 
     /// For each file system, before which operation of the log its changes are there.
     using Prefixes = std::map<dev_t, std::size_t>;
 
+    void decide(Choice& choice, std::size_t write, DataFate fate, std::mt19937_64& random) const;
     [[nodiscard]] std::vector<Choice> orderedChoices(std::size_t done) const;
     [[nodiscard]] std::vector<Choice> unorderedChoices(std::size_t done) const;
     [[nodiscard]] std::size_t committedPrefix(std::size_t done, dev_t device) const;
     /// Every prefix that a cut may leave of a file system, ascending.
     [[nodiscard]] std::vector<std::size_t> possiblePrefixes(std::size_t done, dev_t device) const;
     [[nodiscard]] std::vector<Prefixes> prefixesToTry(std::size_t done, std::mt19937_64& random) const;
-    [[nodiscard]] bool dataIsSynced(std::size_t write, std::size_t done) const;
+    /// Whether an operation after it and before `done` syncs what it changed.
+    [[nodiscard]] bool isSynced(std::size_t operation, std::size_t done) const;
     [[nodiscard]] bool dataIsOrdered(std::size_t write, std::size_t prefix) const;
-    [[nodiscard]] bool isCertain(std::size_t operation, std::size_t done) const;
     /// Adds what each chosen operation started from.
     void completeBackwards(std::vector<bool>& persisted) const;
     [[nodiscard]] PowerCutState build(const Choice& choice, std::size_t done) const;

@@ -3,6 +3,8 @@
 
 #include <cstdlib>
 #include <dirent.h>
+#include <filesystem>
+#include <iterator>
 #include <memory>
 #include <thread>
 #include <unistd.h>
@@ -26,11 +28,8 @@ std::map<int, std::string> openDescriptors() {
 }
 
 std::size_t countThreads() {
-    std::size_t count = 0;
-    const std::unique_ptr<DIR, int (*)(DIR*)> stream(::opendir("/proc/self/task"), ::closedir);
-    while (const dirent* entry = ::readdir(stream.get()))
-        count += entry->d_name[0] != '.' ? 1 : 0;
-    return count;
+    const std::filesystem::directory_iterator tasks("/proc/self/task");
+    return static_cast<std::size_t>(std::distance(begin(tasks), end(tasks)));
 }
 
 } // namespace
@@ -53,8 +52,8 @@ std::string ProcessResources::leakedSince() const {
     }
     // A joined thread may still be listed for a moment.
     std::size_t threads = countThreads();
-    for (int tries = 0; threads > threads_ && tries < 100; ++tries) {
-        ::usleep(10'000);
+    for (int tries = 0; threads > threads_ && tries < 2000; ++tries) {
+        ::usleep(500);
         threads = countThreads();
     }
     if (threads > threads_)

@@ -2,10 +2,7 @@
 #include "support/RecordingDisk.h"
 
 #include <algorithm>
-#include <cstdio>
-#include <cstdlib>
 #include <fcntl.h>
-#include <linux/fs.h>
 #include <unistd.h>
 
 namespace zor::support {
@@ -79,8 +76,8 @@ bool LoggedOperation::touches(InodeId id) const {
 std::string LoggedOperation::describe() const {
     std::string text = nameOf(call);
     if (call == DiskCall::rename)
-        return text + " " + std::to_string(directory) + "/" + name + (exchange ? " <-> " : " -> ") +
-               std::to_string(toDirectory) + "/" + toName + " (" + std::to_string(inode) + ")";
+        return text + " " + std::to_string(directory) + "/" + name + " -> " + std::to_string(toDirectory) + "/" +
+               toName + " (" + std::to_string(inode) + ")";
     if (changesNames())
         return text + " " + std::to_string(directory) + "/" + name + " (" + std::to_string(inode) + ")";
     if (inode != 0)
@@ -95,10 +92,7 @@ std::string LoggedOperation::describe() const {
 void apply(const LoggedOperation& operation, FileTree& tree) {
     const auto entriesOf = [&](InodeId id) -> std::map<std::string, InodeId>& { return tree.inodes.at(id).entries; };
     if (operation.call == DiskCall::rename) {
-        if (operation.exchange)
-            entriesOf(operation.directory)[operation.name] = operation.replaced;
-        else
-            entriesOf(operation.directory).erase(operation.name);
+        entriesOf(operation.directory).erase(operation.name);
         entriesOf(operation.toDirectory)[operation.toName] = operation.inode;
     } else if (operation.call == DiskCall::unlinkFile || operation.call == DiskCall::removeDirectory) {
         entriesOf(operation.directory).erase(operation.name);
@@ -117,11 +111,7 @@ void apply(const LoggedOperation& operation, FileTree& tree) {
 }
 
 RecordingDisk::RecordingDisk(platform::Disk& inner, std::string root, std::set<std::string> excluded)
-    : inner_(inner), root_([&] {
-          char canonical[PATH_MAX];
-          return std::string(::realpath(root.c_str(), canonical) != nullptr ? canonical : root.c_str());
-      }()),
-      excluded_(std::move(excluded)) {}
+    : InterceptedDisk(inner), root_(std::move(root)), excluded_(std::move(excluded)) {}
 
 void RecordingDisk::start() {
     const MutexLock lock(mutex_);
@@ -149,27 +139,11 @@ std::string RecordingDisk::complaint() const {
 }
 
 InodeId RecordingDisk::find(int fd) {
-    if (!recording_)
-        return 0;
     struct stat status = {};
-    if (::fstat(fd, &status) != 0) {
-        complaint_ += "a call on no descriptor; ";
+    if (!recording_ || ::fstat(fd, &status) != 0)
         return 0;
-    }
-    if (const auto found = known_.find({status.st_dev, status.st_ino}); found != known_.end())
-        return found->second;
-    char link[32];
-    char path[PATH_MAX] = {};
-    std::snprintf(link, sizeof link, "/proc/self/fd/%d", fd);
-    if (::readlink(link, path, sizeof path - 1) < 0 || !std::string_view(path).starts_with(root_ + "/"))
-        return 0;
-    const std::string below = std::string(path).substr(root_.size() + 1);
-    for (const std::string& outside : excluded_) {
-        if (below == outside || below.starts_with(outside + "/"))
-            return 0;
-    }
-    complaint_ += "a call on \"" + below + "\", which nothing recorded made; ";
-    return 0;
+    const auto found = known_.find({status.st_dev, status.st_ino});
+    return found == known_.end() ? 0 : found->second;
 }
 
 InodeId RecordingDisk::findEntry(InodeId directory, const std::string& name) const {
@@ -196,42 +170,42 @@ void RecordingDisk::add(LoggedOperation operation) {
     log_.operations.push_back(std::move(operation));
 }
 
-void RecordingDisk::addNew(DiskCall call, int directory, const char* name) {
-    const Place at = place(directory, name);
+void RecordingDisk::addNew(const DiskCallInfo& info) {
+    const Place at = place(info.fd, info.subject);
     if (at.directory == 0)
         return;
     struct stat status = {};
-    if (::fstatat(directory, name, &status, AT_SYMLINK_NOFOLLOW) != 0) {
-        complaint_ += std::string("\"") + name + "\" went as soon as it was made; ";
+    if (::fstatat(info.fd, info.subject.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0) {
+        complaint_ += "\"" + info.subject + "\" went as soon as it was made; ";
         return;
     }
     const InodeId id = nextId_++;
     // The file system may use the number of an inode that is gone again: the newest one is meant.
     known_[{status.st_dev, status.st_ino}] = id;
-    LoggedOperation operation{.call = call, .inode = id, .directory = at.directory, .name = at.name};
-    operation.value = readInode(directory, name);
+    LoggedOperation operation{.call = info.call, .inode = id, .directory = at.directory, .name = at.name};
+    operation.value = readInode(info.fd, info.subject.c_str());
     current_.inodes[id] = operation.value;
     add(std::move(operation));
 }
 
-void RecordingDisk::addRemoval(DiskCall call, int directory, const char* name) {
-    const Place at = place(directory, name);
+void RecordingDisk::addRemoval(const DiskCallInfo& info) {
+    const Place at = place(info.fd, info.subject);
     if (at.directory == 0)
         return;
     const InodeId id = findEntry(at.directory, at.name);
     if (id == 0)
-        complaint_ += std::string("\"") + name + "\" was removed, which nothing recorded made; ";
+        complaint_ += "\"" + info.subject + "\" was removed, which nothing recorded made; ";
     else
-        add({.call = call, .inode = id, .directory = at.directory, .name = at.name});
+        add({.call = info.call, .inode = id, .directory = at.directory, .name = at.name});
 }
 
-void RecordingDisk::addChange(DiskCall call, int fd) {
-    const InodeId id = find(fd);
-    if (id == 0)
-        return;
+/// A change of mode or owner, or a sync.
+void RecordingDisk::addOnDescriptor(const DiskCallInfo& info) {
     struct stat status = {};
-    ::fstat(fd, &status);
-    LoggedOperation operation{.call = call, .inode = id};
+    const InodeId id = find(info.fd);
+    if (id == 0 || ::fstat(info.fd, &status) != 0)
+        return;
+    LoggedOperation operation{.call = info.call, .inode = id};
     operation.value = {.mode = status.st_mode, .uid = status.st_uid, .gid = status.st_gid};
     add(std::move(operation));
 }
@@ -246,33 +220,42 @@ void RecordingDisk::addData(int to, std::uint64_t offset, Bytes bytes) {
     add(std::move(operation));
 }
 
-int RecordingDisk::makeDirectory(int directory, const char* name, mode_t mode) {
+ssize_t RecordingDisk::intercept(const DiskCallInfo& info, const Make& make) {
     const MutexLock lock(mutex_);
-    const int result = inner_.makeDirectory(directory, name, mode);
-    if (result == 0)
-        addNew(DiskCall::makeDirectory, directory, name);
-    return result;
-}
-
-int RecordingDisk::createFile(int directory, const char* name, mode_t mode) {
-    const MutexLock lock(mutex_);
-    const int result = inner_.createFile(directory, name, mode);
-    if (result >= 0)
-        addNew(DiskCall::createFile, directory, name);
-    return result;
-}
-
-int RecordingDisk::makeSymbolicLink(const char* target, int directory, const char* name) {
-    const MutexLock lock(mutex_);
-    const int result = inner_.makeSymbolicLink(target, directory, name);
-    if (result == 0)
-        addNew(DiskCall::makeSymbolicLink, directory, name);
+    const ssize_t result = make();
+    if (result < 0)
+        return result;
+    struct stat synced = {};
+    switch (info.call) {
+    case DiskCall::makeDirectory:
+    case DiskCall::createFile:
+    case DiskCall::makeSymbolicLink:
+    case DiskCall::makeFifo:
+        addNew(info);
+        break;
+    case DiskCall::unlinkFile:
+    case DiskCall::removeDirectory:
+        addRemoval(info);
+        break;
+    case DiskCall::changeMode:
+    case DiskCall::changeOwner:
+    case DiskCall::sync:
+    case DiskCall::orderData:
+        addOnDescriptor(info);
+        break;
+    case DiskCall::syncFileSystem:
+        if (recording_ && ::fstat(info.fd, &synced) == 0)
+            add({.call = info.call, .device = synced.st_dev});
+        break;
+    default: // the others have methods of their own, or are not modelled
+        break;
+    }
     return result;
 }
 
 int RecordingDisk::makeHardLink(int fromDirectory, const char* from, int toDirectory, const char* to) {
     const MutexLock lock(mutex_);
-    const int result = inner_.makeHardLink(fromDirectory, from, toDirectory, to);
+    const int result = inner().makeHardLink(fromDirectory, from, toDirectory, to);
     if (result != 0)
         return result;
     const Place source = place(fromDirectory, from);
@@ -285,17 +268,9 @@ int RecordingDisk::makeHardLink(int fromDirectory, const char* from, int toDirec
     return result;
 }
 
-int RecordingDisk::makeFifo(int directory, const char* name, mode_t mode) {
-    const MutexLock lock(mutex_);
-    const int result = inner_.makeFifo(directory, name, mode);
-    if (result == 0)
-        addNew(DiskCall::makeFifo, directory, name);
-    return result;
-}
-
 int RecordingDisk::rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) {
     const MutexLock lock(mutex_);
-    const int result = inner_.rename(fromDirectory, from, toDirectory, to, flags);
+    const int result = inner().rename(fromDirectory, from, toDirectory, to, flags);
     if (result != 0)
         return result;
     const Place source = place(fromDirectory, from);
@@ -307,59 +282,19 @@ int RecordingDisk::rename(int fromDirectory, const char* from, int toDirectory, 
         complaint_ += std::string("a move of \"") + from + "\" from or to where nothing is recorded; ";
         return result;
     }
-    const InodeId replaced = findEntry(destination.directory, destination.name);
-    if (replaced == moved)
-        return result; // Two names of one inode: the system call does nothing.
     add({.call = DiskCall::rename,
          .inode = moved,
          .directory = source.directory,
          .name = source.name,
          .toDirectory = destination.directory,
          .toName = destination.name,
-         .replaced = replaced,
-         .exchange = (flags & RENAME_EXCHANGE) != 0});
+         .replaced = findEntry(destination.directory, destination.name)});
     return result;
-}
-
-int RecordingDisk::unlinkFile(int directory, const char* name) {
-    const MutexLock lock(mutex_);
-    const int result = inner_.unlinkFile(directory, name);
-    if (result == 0)
-        addRemoval(DiskCall::unlinkFile, directory, name);
-    return result;
-}
-
-int RecordingDisk::removeDirectory(int directory, const char* name) {
-    const MutexLock lock(mutex_);
-    const int result = inner_.removeDirectory(directory, name);
-    if (result == 0)
-        addRemoval(DiskCall::removeDirectory, directory, name);
-    return result;
-}
-
-int RecordingDisk::changeMode(int fd, mode_t mode) {
-    const MutexLock lock(mutex_);
-    const int result = inner_.changeMode(fd, mode);
-    if (result == 0)
-        addChange(DiskCall::changeMode, fd);
-    return result;
-}
-
-int RecordingDisk::changeOwner(int fd, uid_t uid, gid_t gid) {
-    const MutexLock lock(mutex_);
-    const int result = inner_.changeOwner(fd, uid, gid);
-    if (result == 0)
-        addChange(DiskCall::changeOwner, fd);
-    return result;
-}
-
-int RecordingDisk::setTimes(int fd, const timespec& access, const timespec& modification) {
-    return inner_.setTimes(fd, access, modification);
 }
 
 int RecordingDisk::setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) {
     const MutexLock lock(mutex_);
-    const int result = inner_.setAttribute(fd, name, value);
+    const int result = inner().setAttribute(fd, name, value);
     const InodeId id = result == 0 ? find(fd) : 0;
     if (id == 0)
         return result;
@@ -370,26 +305,13 @@ int RecordingDisk::setAttribute(int fd, const char* name, std::span<const std::u
     return result;
 }
 
-int RecordingDisk::setInodeFlags(int fd, int flags) {
-    return inner_.setInodeFlags(fd, flags);
-}
-
 int RecordingDisk::write(int fd, std::span<const std::uint8_t> bytes) {
     const MutexLock lock(mutex_);
     const std::uint64_t offset = writeOffset(fd);
-    const int result = inner_.write(fd, bytes);
+    const int result = inner().write(fd, bytes);
     const auto end = static_cast<std::uint64_t>(::lseek(fd, 0, SEEK_CUR));
     const std::size_t written = result == 0 ? bytes.size() : static_cast<std::size_t>(end - std::min(end, offset));
     addData(fd, offset, Bytes(bytes.begin(), bytes.begin() + static_cast<std::ptrdiff_t>(written)));
-    return result;
-}
-
-int RecordingDisk::cloneData(int from, int to) {
-    const MutexLock lock(mutex_);
-    const int result = inner_.cloneData(from, to);
-    struct stat status = {};
-    if (result == 0 && ::fstat(from, &status) == 0)
-        addData(to, 0, readAt(from, 0, static_cast<std::size_t>(status.st_size)));
     return result;
 }
 
@@ -397,37 +319,10 @@ ssize_t RecordingDisk::copyData(int from, int to, std::size_t bytesMax) {
     const MutexLock lock(mutex_);
     const auto source = static_cast<std::uint64_t>(::lseek(from, 0, SEEK_CUR));
     const std::uint64_t offset = writeOffset(to);
-    const ssize_t count = inner_.copyData(from, to, bytesMax);
+    const ssize_t count = inner().copyData(from, to, bytesMax);
     if (count > 0)
         addData(to, offset, readAt(from, source, static_cast<std::size_t>(count)));
     return count;
-}
-
-int RecordingDisk::sync(int fd) {
-    const MutexLock lock(mutex_);
-    const int result = inner_.sync(fd);
-    const InodeId id = result == 0 ? find(fd) : 0;
-    if (id != 0)
-        add({.call = DiskCall::sync, .inode = id});
-    return result;
-}
-
-int RecordingDisk::syncFileSystem(int fd) {
-    const MutexLock lock(mutex_);
-    const int result = inner_.syncFileSystem(fd);
-    struct stat synced = {};
-    if (result == 0 && recording_ && ::fstat(fd, &synced) == 0)
-        add({.call = DiskCall::syncFileSystem, .device = synced.st_dev});
-    return result;
-}
-
-int RecordingDisk::orderData(int fd) {
-    const MutexLock lock(mutex_);
-    const int result = inner_.orderData(fd);
-    const InodeId id = result == 0 ? find(fd) : 0;
-    if (id != 0)
-        add({.call = DiskCall::orderData, .inode = id});
-    return result;
 }
 
 } // namespace zor::support

@@ -7,17 +7,15 @@
 // made one at a time, so that the log's order is the disk's. Any thread.
 #pragma once
 
-#include "platform/Disk.h"
 #include "platform/Mutex.h"
-#include "support/DiskCall.h"
 #include "support/FileTree.h"
-
-#include <optional>
+#include "support/InterceptedDisk.h"
 
 namespace zor::support {
 
-/// A write that fails after some bytes is logged with those; cloneData and copyData are logged as writes of what they
-/// brought. setTimes and setInodeFlags are not modelled and not logged.
+/// A write that fails after some bytes is logged with those; copyData is logged as a write of what it brought. setTimes
+/// and setInodeFlags are not modelled and not logged; neither are clones and exchanges of names, which no recorded
+/// operation makes and complaint() would tell.
 struct LoggedOperation {
     DiskCall call = DiskCall::sync;
     /// Made, linked, moved, removed, changed, written or synced; 0 for syncFileSystem.
@@ -30,9 +28,8 @@ struct LoggedOperation {
     /// A rename's destination.
     InodeId toDirectory = 0;
     std::string toName;
-    /// What a rename replaced or, when `exchange`, moved the other way.
+    /// What a rename replaced.
     InodeId replaced = 0;
-    bool exchange = false;
     /// The state given to a new inode; the mode or the owner that a change sets; the bytes of a write.
     Inode value;
     std::uint64_t offset = 0;
@@ -58,7 +55,7 @@ struct DiskLog {
 /// the names stand for afterwards, so it can be applied where an earlier one was left out.
 void apply(const LoggedOperation& operation, FileTree& tree);
 
-class RecordingDisk final : public platform::Disk {
+class RecordingDisk final : public InterceptedDisk {
 public:
     /// `excluded` are paths relative to `root`. Records nothing until start.
     RecordingDisk(platform::Disk& inner, std::string root, std::set<std::string> excluded = {});
@@ -72,25 +69,14 @@ public:
     /// differ now. Empty when nothing does.
     [[nodiscard]] std::string complaint() const;
 
-    int makeDirectory(int directory, const char* name, mode_t mode) override;
-    int createFile(int directory, const char* name, mode_t mode) override;
-    int makeSymbolicLink(const char* target, int directory, const char* name) override;
     int makeHardLink(int fromDirectory, const char* from, int toDirectory, const char* to) override;
-    int makeFifo(int directory, const char* name, mode_t mode) override;
     int rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) override;
-    int unlinkFile(int directory, const char* name) override;
-    int removeDirectory(int directory, const char* name) override;
-    int changeMode(int fd, mode_t mode) override;
-    int changeOwner(int fd, uid_t uid, gid_t gid) override;
-    int setTimes(int fd, const timespec& access, const timespec& modification) override;
     int setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) override;
-    int setInodeFlags(int fd, int flags) override;
     int write(int fd, std::span<const std::uint8_t> bytes) override;
-    int cloneData(int from, int to) override;
     ssize_t copyData(int from, int to, std::size_t bytesMax) override;
-    int sync(int fd) override;
-    int syncFileSystem(int fd) override;
-    int orderData(int fd) override;
+
+protected:
+    ssize_t intercept(const DiskCallInfo& info, const Make& make) override;
 
 private:
     /// 0 when the inode is not recorded.
@@ -103,12 +89,11 @@ private:
     };
     [[nodiscard]] Place place(int directory, std::string_view path) ZOR_REQUIRES(mutex_);
     void add(LoggedOperation operation) ZOR_REQUIRES(mutex_);
-    void addNew(DiskCall call, int directory, const char* name) ZOR_REQUIRES(mutex_);
-    void addRemoval(DiskCall call, int directory, const char* name) ZOR_REQUIRES(mutex_);
-    void addChange(DiskCall call, int fd) ZOR_REQUIRES(mutex_);
+    void addNew(const DiskCallInfo& info) ZOR_REQUIRES(mutex_);
+    void addRemoval(const DiskCallInfo& info) ZOR_REQUIRES(mutex_);
+    void addOnDescriptor(const DiskCallInfo& info) ZOR_REQUIRES(mutex_);
     void addData(int to, std::uint64_t offset, Bytes bytes) ZOR_REQUIRES(mutex_);
 
-    platform::Disk& inner_;
     const std::string root_;
     const std::set<std::string> excluded_;
     mutable platform::Mutex mutex_;

@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <array>
+#include <span>
 #include <unistd.h>
 
 namespace zor::support {
@@ -23,7 +24,10 @@ constexpr Place system = {"private/var/containers", "private/var/root/Library/Ca
 constexpr Place mobile = {"private/var/mobile/Containers",
                           "private/var/mobile/Containers/Library/Caches/com.veltra.zorvaned/Temp"};
 
-enum class Inside { nothing, data, group };
+using Inside = std::span<const char* const>;
+constexpr Inside nothing;
+constexpr std::array inGroups = {"Library", "Library/Caches"};
+constexpr std::array inData = {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp"};
 
 struct ContainerKind {
     std::uint64_t number;
@@ -35,33 +39,21 @@ struct ContainerKind {
     mode_t insideMode;
 };
 
-constexpr std::array<ContainerKind, 13> kinds = {{
-    {1, "Bundle/Application", bundles, 33, 33, Inside::nothing, 0},
-    {2, "Data/Application", mobile, 501, 501, Inside::data, 0755},
-    {3, "Bundle/KolvexPlugin", bundles, 33, 33, Inside::nothing, 0},
-    {4, "Data/KolvexPlugin", mobile, 501, 501, Inside::data, 0755},
-    {5, "Bundle/VPNPlugin", bundles, 33, 33, Inside::nothing, 0},
-    {6, "Data/VPNPlugin", mobile, 501, 501, Inside::data, 0755},
-    {7, "Shared/AppGroup", mobile, 501, 501, Inside::group, 0755},
-    {8, "Bundle/Framework", bundles, 33, 33, Inside::nothing, 0},
-    {9, "Data/IpsiService", mobile, 501, 501, Inside::data, 0755},
-    {10, "Data/InternalDaemon", mobile, 501, 501, Inside::data, 0755},
-    {11, "Data/TempDir", mobile, 501, 501, Inside::data, 0755},
-    {12, "Data/System", system, 499, 0, Inside::data, 0777},
-    {13, "Shared/SystemGroup", system, 499, 0, Inside::group, 0777},
-}};
-
-std::vector<const char*> subdirectoriesOf(Inside inside) {
-    switch (inside) {
-    case Inside::nothing:
-        return {};
-    case Inside::group:
-        return {"Library", "Library/Caches"};
-    case Inside::data:
-        return {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp"};
-    }
-    return {};
-}
+constexpr ContainerKind kinds[] = {
+    {1, "Bundle/Application", bundles, 33, 33, nothing, 0},
+    {2, "Data/Application", mobile, 501, 501, inData, 0755},
+    {3, "Bundle/KolvexPlugin", bundles, 33, 33, nothing, 0},
+    {4, "Data/KolvexPlugin", mobile, 501, 501, inData, 0755},
+    {5, "Bundle/VPNPlugin", bundles, 33, 33, nothing, 0},
+    {6, "Data/VPNPlugin", mobile, 501, 501, inData, 0755},
+    {7, "Shared/AppGroup", mobile, 501, 501, inGroups, 0755},
+    {8, "Bundle/Framework", bundles, 33, 33, nothing, 0},
+    {9, "Data/IpsiService", mobile, 501, 501, inData, 0755},
+    {10, "Data/InternalDaemon", mobile, 501, 501, inData, 0755},
+    {11, "Data/TempDir", mobile, 501, 501, inData, 0755},
+    {12, "Data/System", system, 499, 0, inData, 0777},
+    {13, "Shared/SystemGroup", system, 499, 0, inGroups, 0777},
+};
 
 /// What is wrong with the kind, mode or owner; empty when nothing is. Only root can give things to others.
 std::string attributesComplaint(const Inode& inode, mode_t kindAndMode, std::uint32_t owner) {
@@ -96,7 +88,7 @@ std::string judgeContainer(const FileTree& tree, InodeId id, const ContainerKind
     const Inode& top = tree.inodes.at(id);
     if (const std::string wrong = attributesComplaint(top, S_IFDIR | 0755, kind.owner); !wrong.empty())
         return wrong;
-    for (const char* subdirectory : subdirectoriesOf(kind.inside)) {
+    for (const char* subdirectory : kind.inside) {
         const InodeId inside = tree.resolve(container.path + "/" + subdirectory);
         if (inside == 0)
             return std::string("lacks ") + subdirectory;

@@ -2,15 +2,15 @@
 // Bytes for the tests of packed buffers: as people write them, and at the very end of the memory that may be read.
 #pragma once
 
-#include <cctype>
+#include <algorithm>
 #include <cstdint>
 #include <cstdio>
 #include <cstring>
 #include <fstream>
+#include <regex>
 #include <span>
 #include <stdexcept>
 #include <string>
-#include <string_view>
 #include <sys/mman.h>
 #include <unistd.h>
 #include <vector>
@@ -19,25 +19,14 @@ namespace zor::test {
 
 using ByteVector = std::vector<std::uint8_t>;
 
-/// Pairs of digits; everything else but a "#" and what follows it on its line is ignored.
-inline ByteVector fromHex(std::string_view text) {
+/// Pairs of digits; a "#" and what follows it on its line is ignored, and so are spaces.
+inline ByteVector fromHex(const std::string& text) {
+    static const std::regex comment("#[^\n]*");
+    static const std::regex pair("[0-9a-f]{2}");
+    const std::string bare = std::regex_replace(text, comment, "");
     ByteVector bytes;
-    int high = -1;
-    for (std::size_t i = 0; i < text.size(); ++i) {
-        if (text[i] == '#') {
-            i = std::min(text.find('\n', i), text.size() - 1);
-            continue;
-        }
-        if (std::isxdigit(static_cast<unsigned char>(text[i])) == 0)
-            continue;
-        const int digit = std::stoi(std::string(1, text[i]), nullptr, 16);
-        if (high < 0) {
-            high = digit;
-        } else {
-            bytes.push_back(static_cast<std::uint8_t>(high * 16 + digit));
-            high = -1;
-        }
-    }
+    for (std::sregex_iterator at(bare.begin(), bare.end(), pair); at != std::sregex_iterator(); ++at)
+        bytes.push_back(static_cast<std::uint8_t>(std::stoi(at->str(), nullptr, 16)));
     return bytes;
 }
 
@@ -49,6 +38,10 @@ inline std::string toHex(std::span<const std::uint8_t> bytes) {
         text += pair;
     }
     return text;
+}
+
+inline std::string withoutAddresses(const std::string& text) {
+    return std::regex_replace(text, std::regex("0x[0-9a-f]+|\\(nil\\)"), "ADDRESS");
 }
 
 /// A file of tests/upcall/golden.
@@ -63,29 +56,25 @@ inline ByteVector golden(const std::string& name) {
 /// A copy of bytes that ends where the memory does: reading one byte further ends the process, in every build.
 class EdgeOfMemory {
 public:
-    explicit EdgeOfMemory(std::span<const std::uint8_t> bytes) : pageBytes_(static_cast<std::size_t>(::getpagesize())) {
-        mappedBytes_ = (bytes.size() / pageBytes_ + 2) * pageBytes_;
-        void* const mapped = ::mmap(nullptr, mappedBytes_, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
-        if (mapped == MAP_FAILED)
-            throw std::runtime_error("no memory");
-        start_ = static_cast<std::uint8_t*>(mapped);
-        std::uint8_t* const edge = start_ + mappedBytes_ - pageBytes_;
-        if (::mprotect(edge, pageBytes_, PROT_NONE) != 0)
-            throw std::runtime_error("no edge");
+    explicit EdgeOfMemory(std::span<const std::uint8_t> bytes) {
+        const auto pageBytes = static_cast<std::size_t>(::getpagesize());
+        mappedBytes_ = (bytes.size() / pageBytes + 2) * pageBytes;
+        mapped_ = ::mmap(nullptr, mappedBytes_, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+        std::uint8_t* const edge = static_cast<std::uint8_t*>(mapped_) + mappedBytes_ - pageBytes;
+        if (mapped_ == MAP_FAILED || ::mprotect(edge, pageBytes, PROT_NONE) != 0)
+            throw std::runtime_error("no edge of memory");
         data_ = edge - bytes.size();
-        if (!bytes.empty())
-            std::memcpy(data_, bytes.data(), bytes.size());
+        std::ranges::copy(bytes, data_);
     }
-    ~EdgeOfMemory() { ::munmap(start_, mappedBytes_); }
+    ~EdgeOfMemory() { ::munmap(mapped_, mappedBytes_); }
     EdgeOfMemory(const EdgeOfMemory&) = delete;
     EdgeOfMemory& operator=(const EdgeOfMemory&) = delete;
 
     [[nodiscard]] std::uint8_t* data() const { return data_; }
 
 private:
-    const std::size_t pageBytes_;
     std::size_t mappedBytes_ = 0;
-    std::uint8_t* start_ = nullptr;
+    void* mapped_ = nullptr;
     std::uint8_t* data_ = nullptr;
 };
 

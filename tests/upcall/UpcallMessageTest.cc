@@ -74,23 +74,19 @@ TEST(UpcallMessage, TakesOnlyARepliesForm) {
 // containers packed into buffers of every size that cannot grow.
 TEST(UpcallMessage, AReplyThatDoesNotFitSaysSo) {
     const ProcessContainers containers = goldenContainers();
-    const auto lineFor = [&](std::size_t packed) -> std::string {
-        switch (packed) {
-        case 0:
-            return "sb_packbuff_pack_string() fails: 45; type: 100, path: " + *containers.homeDirectory;
-        case 1:
-            return "sb_packbuff_pack_string() fails: 45; type: 1, path: " + *containers.dataContainer;
-        case 2:
-            return "sb_packbuff_pack_string() fails: 45; type: 2, path: " + *containers.temporaryDirectory;
-        case 3:
-        case 4:
-            return "sb_packbuff_pack_key_with_string_value() fails: 45; group ID: group.a, group container: " +
-                   containers.appGroups->at("group.a");
-        default:
-            return "sb_packbuff_pack_key_with_string_value() fails: 45; group ID: sg, system group container: " +
-                   containers.systemGroups->at("sg");
-        }
-    };
+    const std::string path = "sb_packbuff_pack_string() fails: 45; type: ";
+    const std::string pair = "sb_packbuff_pack_key_with_string_value() fails: 45; group ID: ";
+    const std::string group = pair + "group.a, group container: " + containers.appGroups->at("group.a");
+    const std::string systemGroup = pair + "sg, system group container: " + containers.systemGroups->at("sg");
+    // What is said when so many items could be packed.
+    const std::vector<std::vector<std::string>> linesAfter = {{path + "100, path: " + *containers.homeDirectory},
+                                                              {path + "1, path: " + *containers.dataContainer},
+                                                              {path + "2, path: " + *containers.temporaryDirectory},
+                                                              {group},
+                                                              {group},
+                                                              {systemGroup},
+                                                              {systemGroup},
+                                                              {}};
     support::RecordingLog lines(logLevelNotice);
     const Log log(lines);
     const std::size_t whole = golden("reply.hex").size() - ReplyOffset::buffer;
@@ -103,17 +99,15 @@ TEST(UpcallMessage, AReplyThatDoesNotFitSaysSo) {
         UpcallReply reply = replyIn(encodeReply(processContainersMessageId, packed));
         std::vector<std::string> said = lines.take(logLevelError, "server_get_process_containers");
         const bool hasStatus = !reply.items.empty() && reply.items.back().first == CM_KERN_REPLY_STATUS;
-        if (!hasStatus) {
+        if (hasStatus) {
+            reply.items.pop_back();
+        } else {
             ASSERT_FALSE(said.empty());
-            EXPECT_TRUE(said.back().starts_with("sb_packbuff_pack_uint32() fails: 45; type: 0, value: "))
-                << said.back();
+            EXPECT_TRUE(said.back().starts_with("sb_packbuff_pack_uint32() fails: 45; type: 0, value: "));
             said.pop_back();
         }
-        if (hasStatus)
-            reply.items.pop_back();
-        const bool all = reply.items.size() == 7;
-        EXPECT_EQ(said, all ? std::vector<std::string>() : std::vector{lineFor(reply.items.size())});
-        EXPECT_EQ(all && hasStatus, size == whole);
+        EXPECT_EQ(said, linesAfter.at(reply.items.size()));
+        EXPECT_EQ(reply.items.size() == 7 && hasStatus, size == whole);
     }
 }
 

@@ -17,6 +17,8 @@ constexpr const char* routine = "server_get_process_containers";
 constexpr std::uint32_t homeless = 503;
 const std::string dataContainers = std::string(mobileContainers) + "/Data/Application";
 
+const ByteVector good = Items().string(upcall::CM_KERN_REQUEST_CONTAINER_ID, "com.example").number(3, mobile).packet();
+
 ByteVector with(ByteVector packet, std::size_t offset, std::uint32_t number) {
     std::memcpy(packet.data() + offset, &number, sizeof number);
     return packet;
@@ -34,7 +36,8 @@ ByteVector around(const std::string& hex) {
 // Goal: every packet that is no request gets the one code and the lines that it should, and makes nothing. Method: a
 // table of packets, sent by the kernel's agent through a socket.
 TEST(UpcallServer, AnswersEveryFaultyPacket) {
-    const ByteVector good = Items().string(CM_KERN_REQUEST_CONTAINER_ID, "com.example").number(3, mobile).packet();
+    const std::string unpack = "failed: to unpack string for CM_KERN_REQUEST_";
+    const std::string noEnd = "failed: to find the end of the request. error: 34";
     const std::string id = "02 00 00 00 02 00 00 00 61 00 00 00 00 00 00 00 ";
     const std::string end = "00 00 00 00 00 00 00 00";
     ByteVector longer = good;
@@ -43,7 +46,7 @@ TEST(UpcallServer, AnswersEveryFaultyPacket) {
         const char* name;
         ByteVector packet;
         std::int32_t code;
-        const char* line; // of level 3
+        std::string line; // of level 3
     };
     const Row rows[] = {
         {"another message", with(good, 4, 322'514'901), -303, ""},
@@ -64,23 +67,20 @@ TEST(UpcallServer, AnswersEveryFaultyPacket) {
         {"fewer bytes", first(good, good.size() - 1), -300, ""},
         {"a header alone", first(good, 24), -300, ""},
         {"an empty buffer", around(""), 9, "sb_packbuff_init() of request data fails"},
-        {"less than an item", around("00 00 00 00 00 00 00"), 5, "failed: to find the end of the request. error: 34"},
-        {"a cut end", around("01 00 03 00 f5 01 00 00 00 00"), 5, "failed: to find the end of the request. error: 34"},
-        {"no end", around(id), 5, "failed: to unpack string for CM_KERN_REQUEST_CODE_SIGNATURE_ID. error: 34"},
-        {"a number for the code signature", Items().number(0, 1).packet(), 5,
-         "failed: to unpack string for CM_KERN_REQUEST_CODE_SIGNATURE_ID. error: 22"},
-        {"bytes for the container", Items().bytes(1, "a").packet(), 5,
-         "failed: to unpack string for CM_KERN_REQUEST_CONTAINER_ID. error: 22"},
+        {"less than an item", around("00 00 00 00 00 00 00"), 5, noEnd},
+        {"a cut end", around("01 00 03 00 f5 01 00 00 00 00"), 5, noEnd},
+        {"no end", around(id), 5, unpack + "CODE_SIGNATURE_ID. error: 34"},
+        {"a number for the code signature", Items().number(0, 1).packet(), 5, unpack + "CODE_SIGNATURE_ID. error: 22"},
+        {"bytes for the container", Items().bytes(1, "a").packet(), 5, unpack + "CONTAINER_ID. error: 22"},
         {"an unknown item for the application", around("07 00 02 00 02 00 00 00" + end), 5,
-         "failed: to unpack string for CM_KERN_REQUEST_APPLICATION_ID. error: 22"},
+         unpack + "APPLICATION_ID. error: 22"},
         {"a string for the persona", Items().string(3, "501").packet(), 5,
          "failed: to unpack uint32 for CM_KERN_REQUEST_PERSONA_ID. error: 22"},
-        {"an empty item for a group", around("02 00 04 00 00 00 00 00" + end), 5,
-         "failed: to unpack string for CM_KERN_REQUEST_APP_GROUP_ID. error: 22"},
+        {"an empty item for a group", around("02 00 04 00 00 00 00 00" + end), 5, unpack + "APP_GROUP_ID. error: 22"},
         {"no NUL in the system container", around("02 00 06 00 01 00 00 00 61 00 00 00 00 00 00 00" + end), 5,
-         "failed: to unpack string for CM_KERN_REQUEST_SYSTEM_CONTAINER_ID. error: 22"},
+         unpack + "SYSTEM_CONTAINER_ID. error: 22"},
         {"a system group beyond the end", around("02 00 07 00 ff ff ff ff 61 00 00 00 00 00 00 00" + end), 5,
-         "failed: to unpack string for CM_KERN_REQUEST_SYSTEM_GROUP_CONTAINER_ID. error: 34"},
+         unpack + "SYSTEM_GROUP_CONTAINER_ID. error: 34"},
         {"a container type", Items().string(0, "com.example").number(3, mobile).number(5, 2).packet(), 4,
          "CM_KERN_REQUEST_CONTAINER_TYPE is not currently supported!"},
         {"the first unknown item", Items().string(0, "com.example").number(3, mobile).string(8, "a").packet(), 4,
@@ -97,7 +97,7 @@ TEST(UpcallServer, AnswersEveryFaultyPacket) {
         EXPECT_EQ(reply.returnCode, row.code);
         EXPECT_FALSE(reply.bufferBytes);
         std::vector<LogLine> expected;
-        if (*row.line != '\0')
+        if (!row.line.empty())
             expected = {{logLevelError, routine, row.line}};
         EXPECT_EQ(upcall.world.log.take(), expected);
     }
@@ -112,7 +112,6 @@ TEST(UpcallServer, AnswersEveryFaultyPacket) {
 // Goal: nobody but the kernel's agent is answered: not an unregistered program, and not another process on the agent's
 // own connection. Method: real senders; only a sender that is not known at all has to be made up.
 TEST(UpcallServer, AnswersTheKernelAlone) {
-    const ByteVector good = Items().string(CM_KERN_REQUEST_CONTAINER_ID, "com.example").number(3, mobile).packet();
     ServedUpcall unknown(Agent::unknown);
     EXPECT_EQ(replyIn(unknown.exchange(good)).returnCode, 5);
     EXPECT_EQ(replyIn(unknown.exchange(with(good, 4, 1))).returnCode, -303);
@@ -144,69 +143,51 @@ TEST(UpcallServer, AnswersTheKernelAlone) {
 // Goal: a request gets the paths of what it names, in the one order, made where they were missing, and of nothing else.
 // Method: a table of requests; each path is looked at on the disk, each class counted.
 TEST(UpcallServer, TellsTheContainersOfAProcess) {
+    const Items everything = Items()
+                                 .string(7, "sg.b")
+                                 .string(4, "group.b")
+                                 .string(6, "com.example.system")
+                                 .string(0, "com.example.all")
+                                 .string(4, "group.a")
+                                 .string(7, "sg.a")
+                                 .string(4, "group.b")
+                                 .number(3, mobile)
+                                 .string(2, "x");
     struct Row {
-        const char* name;
         Items items;
-        std::vector<unsigned> types;
-        const char* home; // below the root
+        std::string types;
+        std::string home; // below the root
         std::string dataIdentifier;
     };
+    const std::string root = "private/var/root";
+    const std::string mobiles = "private/var/mobile";
     const Row rows[] = {
-        {"nothing", Items(), {100, 0}, "private/var/root", ""},
-        {"code signature alone",
-         Items().string(0, "com.example.signed").number(3, mobile),
-         {100, 1, 2, 0},
-         "private/var/mobile",
-         "com.example.signed"},
-        {"container before code signature",
-         Items().string(1, "com.example.c").string(0, "com.example.s").number(3, mobile),
-         {100, 1, 2, 0},
-         "private/var/mobile",
+        {Items(), "100 0", root, ""},
+        {Items().string(0, "com.example.signed").number(3, mobile), "100 1 2 0", mobiles, "com.example.signed"},
+        // The container counts before the code signature, later items before earlier ones.
+        {Items().string(1, "com.example.c").string(0, "com.example.s").number(3, mobile), "100 1 2 0", mobiles,
          "com.example.c"},
-        {"later ones count",
-         Items().number(3, mobile).string(1, "com.example.1").string(1, "com.example.2").number(3, second),
-         {100, 1, 2, 0},
-         "private/var/second",
-         "com.example.2"},
-        {"application",
-         Items().string(2, "com.example.application").number(3, mobile),
-         {100, 0},
-         "private/var/mobile",
-         ""},
-        {"system container of root's", Items().string(6, "com.example.system"), {100, 101, 0}, "private/var/root", ""},
-        {"everything",
-         Items()
-             .string(7, "sg.b")
-             .string(4, "group.b")
-             .string(6, "com.example.system")
-             .string(0, "com.example.all")
-             .string(4, "group.a")
-             .string(7, "sg.a")
-             .string(4, "group.b")
-             .number(3, mobile)
-             .string(2, "x"),
-         {100, 1, 2, 3, 4, 3, 4, 101, 102, 103, 102, 103, 0},
-         "private/var/mobile",
-         "com.example.all"},
-        {"a user without containers", Items().number(3, 33), {0}, "", ""},
-        {"a user without a home",
-         Items().number(3, homeless).string(7, "sg.a"),
-         {100, 102, 103, 0},
-         "private/var/nowhere",
-         ""},
+        {Items().number(3, mobile).string(1, "com.example.1").string(1, "com.example.2").number(3, second), "100 1 2 0",
+         "private/var/second", "com.example.2"},
+        {Items().string(2, "com.example.application").number(3, mobile), "100 0", mobiles, ""},
+        {Items().string(6, "com.example.system"), "100 101 0", root, ""},
+        {everything, "100 1 2 3 4 3 4 101 102 103 102 103 0", mobiles, "com.example.all"},
+        // A user without containers, and one without a home.
+        {Items().number(3, 33), "0", "", ""},
+        {Items().number(3, homeless).string(7, "sg.a"), "100 102 103 0", "private/var/nowhere", ""},
     };
     ServedUpcall upcall;
     World& world = upcall.world;
     EXPECT_FALSE(world.daemonsClient().allowGroupIdLookup());
     for (const Row& row : rows)
         for (const bool again : {false, true}) {
-            SCOPED_TRACE(std::string(row.name) + (again ? " again" : ""));
+            SCOPED_TRACE(row.types + " " + row.dataIdentifier + (again ? " again" : ""));
             const UpcallReply reply = upcall.ask(row.items);
             EXPECT_EQ(reply.messageId, 322'515'000U);
             EXPECT_EQ(reply.returnCode, 0);
             EXPECT_EQ(reply.types(), row.types);
             EXPECT_EQ(reply.text(0), "1");
-            EXPECT_EQ(reply.text(100), *row.home == '\0' ? "" : world.path(row.home));
+            EXPECT_EQ(reply.text(100), row.home.empty() ? "" : world.path(row.home));
             if (!row.dataIdentifier.empty()) {
                 const std::uint32_t user = reply.text(100).ends_with("second") ? second : mobile;
                 const auto found = world.daemonsClient().createOrLookupContainerForUser(
@@ -219,7 +200,7 @@ TEST(UpcallServer, TellsTheContainersOfAProcess) {
         }
     EXPECT_TRUE(world.daemonsClient().allowGroupIdLookup());
     EXPECT_TRUE(world.daemonsClient().allowOtherIdLookup());
-    const UpcallReply all = upcall.ask(rows[6].items);
+    const UpcallReply all = upcall.ask(everything);
     const auto groupsAre = [&](unsigned type, std::uint32_t user, ContainerClass containerClass,
                                const std::vector<std::string>& identifiers) {
         const auto groups = all.groups(type);
@@ -244,26 +225,24 @@ TEST(UpcallServer, TellsTheContainersOfAProcess) {
 // identifier that no file can hold, between two good groups.
 TEST(UpcallServer, TellsAllOrNothing) {
     struct Row {
-        const char* name;
         std::uint16_t type;
         std::string_view identifier;
         std::uint32_t persona;
-        const char* line;
+        std::string line;
     };
     constexpr std::string_view cut("group.a\0b", 9);
     const Row rows[] = {
-        {"data container", 1, "\xff", mobile, "createOrLookupContainerForUser: Failed with error: 34"},
-        {"system container", 6, cut, mobile, "createOrLookupContainerForUser:(system container) Failed with error: 34"},
-        {"group", 4, cut, mobile, "createOrLookupGroupContainersForUser: Failed with error: 34"},
-        {"system group", 7, "\xc3", mobile,
-         "createOrLookupContainerForUser:(system group container) Failed with error: 34"},
-        {"persona that owns none", 1, "com.example", 0, "createOrLookupContainerForUser: Failed with error: 11"},
+        {1, "\xff", mobile, "createOrLookupContainerForUser: Failed with error: 34"},
+        {6, cut, mobile, "createOrLookupContainerForUser:(system container) Failed with error: 34"},
+        {4, cut, mobile, "createOrLookupGroupContainersForUser: Failed with error: 34"},
+        {7, "\xc3", mobile, "createOrLookupContainerForUser:(system group container) Failed with error: 34"},
+        {1, "com.example", 0, "createOrLookupContainerForUser: Failed with error: 11"}, // it owns none
     };
     ServedUpcall upcall;
     World& world = upcall.world;
     int made = 0;
     for (const Row& row : rows) {
-        SCOPED_TRACE(row.name);
+        SCOPED_TRACE(row.line);
         ++made;
         const std::string before = "sg.before" + std::to_string(made);
         const std::string after = "sg.after" + std::to_string(made);
@@ -286,8 +265,7 @@ TEST(UpcallServer, TellsAllOrNothing) {
     EXPECT_TRUE(world.disk().met());
     world.disk().disarm();
     EXPECT_EQ(reply.items, (std::vector<std::pair<unsigned, std::string>>{{0, "0"}}));
-    EXPECT_EQ(upcall.ask(Items().number(3, mobile).string(4, "group.1").string(4, "group.2")).types(),
-              (std::vector<unsigned>{100, 3, 4, 3, 4, 0}));
+    EXPECT_EQ(upcall.ask(Items().number(3, mobile).string(4, "group.1").string(4, "group.2")).types(), "100 3 4 3 4 0");
 }
 
 // Goal: at level 7 a request leaves these lines in this order, and at level 5 none. Method: whole logs, addresses taken
@@ -303,12 +281,7 @@ TEST(UpcallServer, TracesARequest) {
     std::vector<std::string> said;
     for (const LogLine& line : upcall.world.log.take())
         if (line.function == "demux_server" || line.function == routine)
-            said.push_back(std::to_string(line.level) + " " + line.function + ": " +
-                           line.message.substr(0, line.message.find(" (0x")) +
-                           (line.message.find(" (0x") == std::string::npos ? "" : " (ADDRESS)"));
-    for (std::string& line : said)
-        for (std::size_t at = line.find("0x"); at != std::string::npos; at = line.find("0x"))
-            line.replace(at, line.find_first_not_of("0123456789abcdef", at + 2) - at, "ADDRESS");
+            said.push_back(std::to_string(line.level) + " " + line.function + ": " + withoutAddresses(line.message));
     const std::string data = reply.text(1);
     const std::string prefix = "7 " + std::string(routine) + ": ";
     EXPECT_EQ(said, (std::vector<std::string>{
@@ -346,7 +319,7 @@ TEST(UpcallServer, AnswersWhatCannotBeSent) {
     const ByteVector packet = Items().string(0, "com.example").number(3, mobile).packet();
     const platform::UpcallPacket sent{.bytes = packet, .senderPid = 0, .senderUserId = 0};
     const ByteVector whole = server.answer(sent);
-    EXPECT_EQ(replyIn(whole).types(), (std::vector<unsigned>{100, 1, 2, 0}));
+    EXPECT_EQ(replyIn(whole).types(), "100 1 2 0");
     port.bytesMax = whole.size();
     EXPECT_EQ(toHex(server.answer(sent)), toHex(whole));
     world.log.take();
@@ -397,7 +370,7 @@ TEST(UpcallServer, SendsLargeRepliesThroughItsPort) {
     }
     EXPECT_TRUE(wasEmpty);
     EXPECT_GT(largest, bytesMax / 4);
-    EXPECT_EQ(upcall.ask(Items().number(3, mobile).string(4, "g1")).types(), (std::vector<unsigned>{100, 3, 4, 0}));
+    EXPECT_EQ(upcall.ask(Items().number(3, mobile).string(4, "g1")).types(), "100 3 4 0");
 }
 
 // Goal: while a lookup takes long, what waits is bounded by the socket and costs the daemon nothing; then all of it is
@@ -418,7 +391,7 @@ TEST(UpcallServer, ASlowLookupBoundsWhatWaits) {
         EXPECT_LT(sent, packetsMax / 10);
     }
     for (int i = 0; i < sent; ++i)
-        ASSERT_EQ(replyIn(receivePacket(socket.get())).types(), (std::vector<unsigned>{100, 1, 2, 0})) << i;
+        ASSERT_EQ(replyIn(receivePacket(socket.get())).types(), "100 1 2 0") << i;
 }
 
 } // namespace

@@ -6,6 +6,7 @@
 #include "platform/linux/Names.h"
 
 #include <fcntl.h>
+#include <filesystem>
 #include <future>
 #include <gtest/gtest.h>
 #include <sys/socket.h>
@@ -16,12 +17,6 @@ namespace zor::test {
 using platform::FileDescriptor;
 
 namespace {
-
-std::string ownProgram() {
-    char path[4096];
-    const ssize_t length = ::readlink("/proc/self/exe", path, sizeof path);
-    return {path, length > 0 ? static_cast<std::size_t>(length) : 0};
-}
 
 std::uint32_t numberAt(std::span<const std::uint8_t> bytes, std::size_t offset) {
     std::uint32_t number = 0;
@@ -55,19 +50,17 @@ ByteVector Items::buffer() const {
     return {bytes, bytes + sb_packbuff_get_size(packbuff_.get())};
 }
 
-std::vector<unsigned> UpcallReply::types() const {
-    std::vector<unsigned> types;
+std::string UpcallReply::types() const {
+    std::string types;
     for (const auto& [type, text] : items)
-        types.push_back(type);
+        types += (types.empty() ? "" : " ") + std::to_string(type);
     return types;
 }
 
 std::string UpcallReply::text(unsigned type) const {
-    std::vector<std::string> found;
-    for (const auto& [itemType, text] : items)
-        if (itemType == type)
-            found.push_back(text);
-    return found.size() == 1 ? found.front() : "";
+    const auto isOfType = [&](const auto& item) { return item.first == type; };
+    const auto found = std::ranges::find_if(items, isOfType);
+    return std::ranges::count_if(items, isOfType) == 1 ? found->second : "";
 }
 
 std::vector<std::pair<std::string, std::string>> UpcallReply::groups(unsigned keyType) const {
@@ -121,7 +114,8 @@ UpcallReply replyIn(std::span<const std::uint8_t> packet) {
 ServedUpcall::ServedUpcall(Agent agent, World::Options options) : world(std::move(options)) {
     if (agent == Agent::registered)
         world.write(std::string(platform::names::identityDirectory) + "/agent" + platform::names::identityFileSuffix,
-                    binary(plist::Dictionary{{"Executable", ownProgram()}, {"KernelAgent", true}}));
+                    binary(plist::Dictionary{{"Executable", std::filesystem::read_symlink("/proc/self/exe").string()},
+                                             {"KernelAgent", true}}));
     world.restart();
     std::promise<void> ready;
     thread_ = std::thread([this, &ready] {

@@ -43,7 +43,8 @@ struct UpcallReply {
     /// The size of the reply's buffer; absent when it has none.
     std::optional<std::size_t> bufferBytes;
 
-    [[nodiscard]] std::vector<unsigned> types() const;
+    /// In order, with spaces between.
+    [[nodiscard]] std::string types() const;
     /// The only item of a type; "" when there is none or are several.
     [[nodiscard]] std::string text(unsigned type) const;
     /// Each item of `keyType` with the one behind it.

@@ -15,12 +15,9 @@ namespace zor::whole {
 
 namespace {
 
-constexpr std::uint64_t dataApplication = 2;
-
 /// What a container of class 2 must have wherever one is found under its final name.
 void expectWhole(const std::string& path) {
-    for (const char* item : {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp",
-                             ".com.veltra.zorvane.metadata.plist"}) {
+    for (const char* item : {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp", metadataFile}) {
         struct stat status{};
         ASSERT_EQ(::lstat((path + "/" + item).c_str(), &status), 0) << path << "/" << item;
         const bool metadata = item[0] == '.';
@@ -51,8 +48,7 @@ TEST(Life, KilledAtAnyMomentFindsEveryAcknowledgedContainerWhole) {
                 for (int i = 0;; ++i) {
                     const std::string identifier = "org.example.r" + std::to_string(round) + ".t" +
                                                    std::to_string(thread) + "." + std::to_string(i);
-                    const auto made = client.createOrLookup(
-                        {.containerClass = dataApplication, .user = 501, .identifier = identifier, .create = true});
+                    const auto made = client.createOrLookup(dataContainer(identifier));
                     if (!made)
                         return;
                     const std::lock_guard held(mutex);
@@ -68,8 +64,7 @@ TEST(Life, KilledAtAnyMomentFindsEveryAcknowledgedContainerWhole) {
     auto client = daemon.client();
     ASSERT_GT(acknowledged.size(), 10u);
     for (const auto& [identifier, uuid] : acknowledged) {
-        const auto found =
-            client.createOrLookup({.containerClass = dataApplication, .user = 501, .identifier = identifier});
+        const auto found = client.createOrLookup(dataContainer(identifier));
         ASSERT_TRUE(found) << identifier << ": " << found.error().message;
         EXPECT_TRUE(found->existed);
         EXPECT_EQ(zorvane::uuidText(found->uuid), uuid) << identifier;
@@ -89,21 +84,17 @@ TEST(Life, SecondDaemonAndSigtermAndBrokenCommandLines) {
     std::filesystem::create_directories(daemon.path("run/zorvane/zorvaned.status/occupied"));
     daemon.start();
     EXPECT_NE(daemon.log().find("No status socket: "), std::string::npos); // a help, not a service
-    const auto second = daemon.runAnother();
+    const auto second = runProgram({programPath("zorvaned"), "--root", daemon.root()});
     EXPECT_EQ(second.exitStatus, 1);
     EXPECT_NE(second.output.find("zorvaned: "), std::string::npos) << second.output;
     EXPECT_EQ(daemon.terminate(), 0);
-    for (const auto& [arguments, status] :
-         std::vector<std::pair<std::vector<std::string>, int>>{{{"--root"}, 2},
-                                                               {{"--log-level", "x"}, 2},
-                                                               {{"--nothing"}, 2},
-                                                               {{"stray"}, 2},
-                                                               {{"--help"}, 0},
-                                                               {{"--version"}, 0},
-                                                               {{"--root", "/nowhere"}, 1}}) {
-        std::vector<std::string> all = {programPath("zorvaned")};
-        all.insert(all.end(), arguments.begin(), arguments.end());
-        EXPECT_EQ(runProgram(all).exitStatus, status) << arguments[0];
+    const std::pair<std::vector<std::string>, int> rows[] = {
+        {{"--root"}, 2}, {{"--log-level", "x"}, 2}, {{"--nothing"}, 2},         {{"stray"}, 2},
+        {{"--help"}, 0}, {{"--version"}, 0},        {{"--root", "/nowhere"}, 1}};
+    for (const auto& [arguments, status] : rows) {
+        std::vector<std::string> words = {programPath("zorvaned")};
+        words.insert(words.end(), arguments.begin(), arguments.end());
+        EXPECT_EQ(runProgram(words).exitStatus, status) << arguments[0];
     }
 }
 
@@ -111,32 +102,21 @@ TEST(Life, SecondDaemonAndSigtermAndBrokenCommandLines) {
 TEST(Life, RebootClearsTransientContainersAndOrphans) {
     DaemonProcess daemon;
     daemon.start();
-    std::string transientPath;
-    {
-        auto client = daemon.client();
-        const auto kept = client.createOrLookup(
-            {.containerClass = dataApplication, .user = 501, .identifier = "kept", .create = true});
-        const auto transient = client.createOrLookup({.containerClass = dataApplication,
-                                                      .user = 501,
-                                                      .identifier = "passing",
-                                                      .create = true,
-                                                      .transient = true});
-        ASSERT_TRUE(kept && transient);
-        transientPath = transient->path;
-    }
+    ASSERT_TRUE(daemon.client().createOrLookup(dataContainer("kept")));
+    const std::string transient = daemon.client().createOrLookup(dataContainer("passing", true)).value().path;
     daemon.kill();
     const std::string classDirectory = daemon.path("private/var/mobile/Containers/Data/Application/");
-    std::filesystem::create_directory(classDirectory + "Junk");
-    std::filesystem::create_directory(classDirectory + "6F9619FF-8B86-D011-B42D-00C04FC964FF");
+    const std::string orphans[] = {classDirectory + "Junk", classDirectory + "6F9619FF-8B86-D011-B42D-00C04FC964FF"};
+    for (const std::string& orphan : orphans)
+        std::filesystem::create_directory(orphan);
     daemon.start();
-    EXPECT_TRUE(std::filesystem::exists(transientPath)) << "an ordinary restart is no boot";
-    EXPECT_TRUE(std::filesystem::exists(classDirectory + "Junk"));
+    EXPECT_TRUE(std::filesystem::exists(transient)) << "an ordinary restart is no boot";
+    EXPECT_TRUE(std::filesystem::exists(orphans[0]));
     daemon.kill();
     daemon.start({"--forget-boot"});
-    EXPECT_FALSE(std::filesystem::exists(transientPath));
-    EXPECT_FALSE(std::filesystem::exists(classDirectory + "Junk"));
-    EXPECT_FALSE(std::filesystem::exists(classDirectory + "6F9619FF-8B86-D011-B42D-00C04FC964FF"));
-    EXPECT_TRUE(daemon.client().createOrLookup({.containerClass = dataApplication, .user = 501, .identifier = "kept"}));
+    for (const std::string& gone : {transient, orphans[0], orphans[1]})
+        EXPECT_FALSE(std::filesystem::exists(gone)) << gone;
+    EXPECT_TRUE(daemon.client().createOrLookup(dataContainer("kept")).value().existed);
 }
 
 struct ToolCall {
@@ -144,12 +124,11 @@ struct ToolCall {
     int exitStatus;
     const char* inOutput;
 };
-void expectCall(const std::string& root, const ToolCall& row) {
-    std::vector<std::string> all = {programPath("zorvanectl"), "--root", root};
-    if (!row.arguments.empty() && row.arguments[0] == "--root")
-        all.resize(1);
-    all.insert(all.end(), row.arguments.begin(), row.arguments.end());
-    const auto outcome = runProgram(all);
+void expectCall(const DaemonProcess& daemon, const ToolCall& row) {
+    std::vector<std::string> words = daemon.toolWords(row.arguments);
+    if (!row.arguments.empty() && row.arguments[0] == "--root") // another than the daemon's
+        words.erase(words.begin() + 1, words.begin() + 3);
+    const auto outcome = runProgram(words);
     EXPECT_EQ(outcome.exitStatus, row.exitStatus) << ::testing::PrintToString(row.arguments) << outcome.output;
     EXPECT_NE(outcome.output.find(row.inOutput), std::string::npos)
         << ::testing::PrintToString(row.arguments) << outcome.output;
@@ -159,7 +138,7 @@ void expectCall(const std::string& root, const ToolCall& row) {
 TEST(Tool, ExitCodesAndOutput) {
     DaemonProcess daemon;
     daemon.start();
-    const std::string root = daemon.root();
+    const std::string controls = "\302\23331m"; // would colour a terminal
     const std::vector<ToolCall> rows = {
         {{"create", "a.b", "--class", "data-app", "--user", "501"}, 0, "a.b created"},
         {{"lookup", "a.b", "--class", "2"}, 0, "a.b exists"},
@@ -228,20 +207,10 @@ TEST(Tool, ExitCodesAndOutput) {
         {{"--help"}, 0, "Examples"},
         {{"--root", "/nowhere", "status"}, 3, "cannot reach zorvaned"},
         {{"--root", "/nowhere", "--json", "list", "--class", "2"}, 3, "\"unreachable\""},
-        {{"create",
-          "\xc2\x9b"
-          "31m",
-          "--class", "2"},
-         0,
-         "\\xc2\\x9b31m created"},
+        {{"create", controls, "--class", "2"}, 0, "\\xc2\\x9b31m created"},
         {{"--json", "list", "--class", "2"}, 0, "\"\\u009b31m\""},
         // With --json, what the tool itself refuses is JSON too.
-        {{"--json", "wipe",
-          "\xc2\x9b"
-          "31m",
-          "--class", "2"},
-         2,
-         "{\n  \"error\""},
+        {{"--json", "wipe", controls, "--class", "2"}, 2, "{\n  \"error\""},
         {{"--json", "info", "set", "a.b", "k", "null", "--class", "2"}, 2, "{\n  \"error\""},
         {{"--json", "entitlements", "set", "a.b"}, 2, "{\n  \"error\""},
         {{"--json", "entitlements", "set", "a.b", "--from", "/nowhere"}, 2, "{\n  \"error\""},
@@ -250,7 +219,7 @@ TEST(Tool, ExitCodesAndOutput) {
         {{"lookup", "--class", "--json"}, 2, "{\n  \"error\""},
     };
     for (const ToolCall& row : rows)
-        expectCall(root, row);
+        expectCall(daemon, row);
 }
 
 // Goal: a change of protection class that waits for an unlock ends with the daemon: its client hears so, nothing of it
@@ -258,36 +227,33 @@ TEST(Tool, ExitCodesAndOutput) {
 TEST(Life, KilledWhileAChangeOfProtectionWaits) {
     DaemonProcess daemon;
     daemon.start();
-    const std::string root = daemon.root();
     const std::vector<std::string> show = {"--json", "protection", "a.b", "--class", "2"};
-    expectCall(root, {{"create", "a.b", "--class", "2"}, 0, "created"});
-    expectCall(root, {{"protect", "a.b", "3", "--class", "2", "--third-party"}, 0, "has class 3"});
-    expectCall(root, {{"lock-state", "1"}, 0, "locked"});
+    expectCall(daemon, {{"create", "a.b", "--class", "2"}, 0, "created"});
+    expectCall(daemon, {{"protect", "a.b", "3", "--class", "2", "--third-party"}, 0, "has class 3"});
+    expectCall(daemon, {{"lock-state", "1"}, 0, "locked"});
     auto waiting = std::async(std::launch::async, [&daemon] {
         return daemon.client().setDataProtection({.containerClass = dataApplication,
-                                                  .user = 501,
+                                                  .user = mobile,
                                                   .identifier = "a.b",
                                                   .protectionClass = 1,
                                                   .thirdParty = true,
                                                   .retryIfLocked = true});
     });
-    std::vector<std::string> words = {programPath("zorvanectl"), "--root", root};
-    words.insert(words.end(), show.begin(), show.end());
     bool waits = false;
     for (int tries = 0; tries < 200 && !waits; ++tries)
-        waits = runProgram(words).output.find("\"waitsForUnlock\": true") != std::string::npos;
+        waits = daemon.tool(show).output.find("\"waitsForUnlock\": true") != std::string::npos;
     ASSERT_TRUE(waits);
     daemon.kill();
     const auto answer = waiting.get();
     ASSERT_FALSE(answer);
     EXPECT_EQ(answer.error().kind, zorvane::Error::Kind::refused) << answer.error().message;
     daemon.start();
-    expectCall(root, {show, 0, "\"pending\": null"});
-    expectCall(root, {show, 0, "\"recorded\": 3"});
-    expectCall(root, {{"lock-state", "0"}, 0, "unlocked"});
-    expectCall(root, {show, 0, "\"recorded\": 3"});
-    expectCall(root, {{"protect", "a.b", "1", "--class", "2", "--third-party"}, 0, "has class 1"});
-    expectCall(root, {show, 0, "\"recorded\": 1"});
+    expectCall(daemon, {show, 0, "\"pending\": null"});
+    expectCall(daemon, {show, 0, "\"recorded\": 3"});
+    expectCall(daemon, {{"lock-state", "0"}, 0, "unlocked"});
+    expectCall(daemon, {show, 0, "\"recorded\": 3"});
+    expectCall(daemon, {{"protect", "a.b", "1", "--class", "2", "--third-party"}, 0, "has class 1"});
+    expectCall(daemon, {show, 0, "\"recorded\": 1"});
 }
 
 // Goal: a size that cannot be told is not told as none, and its question costs no other. Method: no answer to it.
@@ -298,9 +264,12 @@ TEST(Tool, SaysWhatItCouldNotMeasure) {
         return command == ipc::Command::getDiskUsage ? Relay::Fate::unanswered : Relay::Fate::passedOn;
     });
     const std::string root = relay.root();
-    expectCall(root, {{"create", "a.b", "--class", "2"}, 0, "created"});
-    expectCall(root, {{"--timeout", "1000", "wipe", "a.b", "--class", "2"}, 2, "an unknown number of bytes"});
-    expectCall(root, {{"--timeout", "1000", "--json", "delete", "a.b", "--class", "2", "--yes"}, 0, "\"bytes\": null"});
+    expectCall(daemon, {{"--root", root, "create", "a.b", "--class", "2"}, 0, "created"});
+    expectCall(daemon,
+               {{"--root", root, "--timeout", "1000", "wipe", "a.b", "--class", "2"}, 2, "an unknown number of bytes"});
+    expectCall(daemon, {{"--root", root, "--timeout", "1000", "--json", "delete", "a.b", "--class", "2", "--yes"},
+                        0,
+                        "\"bytes\": null"});
 }
 
 // Goal: damage is found, told and mended as promised, with a daemon and without one. Method: a table of calls over a
@@ -308,27 +277,23 @@ TEST(Tool, SaysWhatItCouldNotMeasure) {
 TEST(Tool, ChecksAndRepairs) {
     DaemonProcess daemon;
     daemon.start();
-    const std::string root = daemon.root();
-    expectCall(root, {{"create", "a.b", "--class", "data-app", "--user", "501"}, 0, "created"});
-    expectCall(root, {{"--json", "check"}, 0, "\"findings\": []"});
-    const auto found =
-        daemon.client().createOrLookup({.containerClass = dataApplication, .user = 501, .identifier = "a.b"});
-    ASSERT_TRUE(found);
-    const std::string documents = found->path + "/Documents";
+    expectCall(daemon, {{"create", "a.b", "--class", "data-app", "--user", "501"}, 0, "created"});
+    expectCall(daemon, {{"--json", "check"}, 0, "\"findings\": []"});
+    const std::string documents = daemon.client().createOrLookup(dataContainer("a.b")).value().path + "/Documents";
     std::filesystem::remove(documents);
-    expectCall(root, {{"check"}, 4, "subdirectory-missing"});
-    expectCall(root, {{"--json", "check"}, 4, "\"code\": \"subdirectory-missing\""});
-    expectCall(root, {{"check", "--repair", "--dry-run"}, 4, "of a.b in Data/Application are made again"});
+    expectCall(daemon, {{"check"}, 4, "subdirectory-missing"});
+    expectCall(daemon, {{"--json", "check"}, 4, "\"code\": \"subdirectory-missing\""});
+    expectCall(daemon, {{"check", "--repair", "--dry-run"}, 4, "of a.b in Data/Application are made again"});
     EXPECT_FALSE(std::filesystem::exists(documents));
-    expectCall(root, {{"check", "--repair"}, 0, "of a.b in Data/Application are made again"});
+    expectCall(daemon, {{"check", "--repair"}, 0, "of a.b in Data/Application are made again"});
     EXPECT_TRUE(std::filesystem::exists(documents));
-    expectCall(root, {{"explain", "subdirectory-missing"}, 0, "Consequence"});
-    expectCall(root, {{"check", "--dry-run"}, 2, "--repair"});
-    expectCall(root, {{"--root", "/nowhere", "--json", "check"}, 5, "\"local\""});
+    expectCall(daemon, {{"explain", "subdirectory-missing"}, 0, "Consequence"});
+    expectCall(daemon, {{"check", "--dry-run"}, 2, "--repair"});
+    expectCall(daemon, {{"--root", "/nowhere", "--json", "check"}, 5, "\"local\""});
     daemon.kill();
-    expectCall(root, {{"check"}, 0, "The store is whole"});
+    expectCall(daemon, {{"check"}, 0, "The store is whole"});
     std::filesystem::remove(documents);
-    expectCall(root, {{"check", "--repair"}, 3, "cannot reach"});
+    expectCall(daemon, {{"check", "--repair"}, 3, "cannot reach"});
 }
 
 } // namespace zor::whole

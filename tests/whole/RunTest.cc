@@ -3,14 +3,12 @@
 // root, and a kernel that allows namespaces here.
 #include "process/DaemonProcess.h"
 
+#include <algorithm>
 #include <csignal>
 #include <fcntl.h>
 #include <filesystem>
-#include <fstream>
 #include <gtest/gtest.h>
-#include <sstream>
 #include <sys/file.h>
-#include <sys/wait.h>
 #include <thread>
 
 namespace zor::whole {
@@ -22,17 +20,6 @@ using Words = std::vector<std::string>;
 
 const std::string notes = "org.example.notes";
 const std::string maps = "org.example.maps";
-
-std::string contentOf(const std::string& path) {
-    std::ostringstream text;
-    text << std::ifstream(path).rdbuf();
-    return text.str();
-}
-
-void writeFile(const std::string& path, const std::string& text, mode_t mode = 0644) {
-    std::ofstream(path, std::ios::trunc) << text;
-    ::chmod(path.c_str(), mode);
-}
 
 bool waitUntil(const std::function<bool()>& condition) {
     for (int tries = 0; tries < 1000; ++tries) {
@@ -65,12 +52,8 @@ public:
 
     explicit Launcher(const std::string& entry = agent) {
         // A folder that every user can reach, whatever the checkout lies in.
-        program_ = daemon.path("zorvane-run");
-        files::copy_file(programPath("zorvane-run"), program_);
-        writeFile(daemon.path("etc/zorvane/identities.d/30-run.plist"),
-                  "<plist version=\"1.0\"><dict><key>Identifier</key><string>com.veltra.zorvane-run</string>"
-                  "<key>Executable</key><string>" +
-                      program_ + "</string>" + entry + "</dict></plist>");
+        files::copy_file(programPath("zorvane-run"), program);
+        daemon.registerProgram("30-run", program, entry);
         daemon.start();
         for (const std::string& identifier : {notes, maps})
             setGroups(identifier, {"group.shared"});
@@ -86,66 +69,30 @@ public:
         ASSERT_TRUE(daemon.client().processEntitlements({.identifier = identifier, .entitlements = entitlements}));
     }
     [[nodiscard]] std::string data(const std::string& identifier, std::uint32_t user = 501) const {
-        const auto found = daemon.client().createOrLookup(
-            {.containerClass = 2, .user = user, .identifier = identifier, .create = true});
-        return found ? found->path : "";
+        auto lookup = dataContainer(identifier);
+        lookup.user = user;
+        return daemon.client().createOrLookup(lookup).value().path;
     }
     [[nodiscard]] std::string group(const std::string& identifier, const std::string& group) const {
         return daemon.client().groupContainerPaths(501, identifier).value()[group];
     }
     [[nodiscard]] Words words(const std::string& identifier, const Words& more) const {
-        Words all = {program_, "--root", daemon.root(), "--identifier", identifier, "--user", "501"};
+        Words all = {program, "--root", daemon.root(), "--identifier", identifier, "--user", "501"};
         all.insert(all.end(), more.begin(), more.end());
         return all;
     }
-    [[nodiscard]] DaemonProcess::Outcome run(const std::string& identifier, const Words& more) const {
+    [[nodiscard]] Outcome run(const std::string& identifier, const Words& more) const {
         return runProgram(words(identifier, more));
     }
-    [[nodiscard]] DaemonProcess::Outcome shell(const std::string& identifier, const std::string& script) const {
+    [[nodiscard]] Outcome shell(const std::string& identifier, const std::string& script) const {
         return run(identifier, {"--", "sh", "-c", script});
     }
-    [[nodiscard]] const std::string& program() const { return program_; }
 
     DaemonProcess daemon;
-
-private:
-    std::string program_;
+    const std::string program = daemon.path("zorvane-run");
 };
 
-/// The launcher in the background; its output goes to a file.
-class Background {
-public:
-    Background(const Words& words, const std::string& output) {
-        std::vector<char*> pointers;
-        for (const std::string& word : words)
-            pointers.push_back(const_cast<char*>(word.c_str()));
-        pointers.push_back(nullptr);
-        pid_ = ::fork();
-        if (pid_ == 0) {
-            const int file = ::open(output.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-            ::dup2(file, 1);
-            ::execv(pointers[0], pointers.data());
-            ::_exit(127);
-        }
-    }
-    ~Background() {
-        if (pid_ > 0) {
-            ::kill(pid_, SIGKILL);
-            (void)end();
-        }
-    }
-    Background(const Background&) = delete;
-    Background& operator=(const Background&) = delete;
-    [[nodiscard]] pid_t pid() const { return pid_; }
-    int end() {
-        int status = 0;
-        ::waitpid(std::exchange(pid_, -1), &status, 0);
-        return WIFEXITED(status) ? WEXITSTATUS(status) : -WTERMSIG(status);
-    }
-
-private:
-    pid_t pid_ = -1;
-};
+} // namespace
 
 // Goal: while the daemon changes a program's files, the program is not started, or is started when that has ended; a
 // file that a killed daemon left keeps nobody. Method: a lock on the assertion's file, held and let go by the test.
@@ -163,14 +110,13 @@ TEST(Run, TerminationAssertions) {
     EXPECT_NE(refused.output.find("may not be started now: its files are being changed"), std::string::npos)
         << refused.output;
     EXPECT_EQ(launcher.run(maps, {"--", "true"}).exitStatus, 0);
-    const std::string output = launcher.daemon.path("waited");
-    Background waiting(launcher.words(notes, {"--wait", "--", "echo", "started"}), output);
+    Program waiting(launcher.words(notes, {"--wait", "--", "echo", "started"}));
     std::this_thread::sleep_for(std::chrono::milliseconds(200));
-    EXPECT_EQ(contentOf(output), "");
+    EXPECT_EQ(waiting.said(), "");
     ::unlink(file.c_str());
     ::close(held);
-    EXPECT_EQ(waiting.end(), 0);
-    EXPECT_EQ(contentOf(output), "started\n");
+    EXPECT_EQ(waiting.wait(), 0);
+    EXPECT_EQ(waiting.said(), "started\n");
 }
 
 // Goal: what the daemon begins while a program is being made ready keeps it from starting, too; whoever waits gets the
@@ -179,7 +125,6 @@ TEST(Run, AnAssertionTakenMeanwhile) {
     ZOR_NEEDS_SANDBOX();
     Launcher launcher;
     const std::string file = launcher.daemon.path("run/zorvane/assertions/") + notes;
-    const std::string output = launcher.daemon.path("output");
     const std::string old = launcher.data(notes);
     files::create_directories(launcher.daemon.path("run/zorvane/assertions"));
     for (const bool waits : {false, true}) {
@@ -187,7 +132,7 @@ TEST(Run, AnAssertionTakenMeanwhile) {
         Words words = {"--", "sh", "-c", "echo $HOME"};
         if (waits)
             words.insert(words.begin(), "--wait");
-        Background run(launcher.words(notes, words), output);
+        Program run(launcher.words(notes, words));
         const std::string descriptors = "/proc/" + std::to_string(run.pid()) + "/fd";
         EXPECT_TRUE(waitUntil([&] {
             return std::ranges::any_of(files::directory_iterator(descriptors), [](const auto& entry) {
@@ -201,26 +146,26 @@ TEST(Run, AnAssertionTakenMeanwhile) {
         ::kill(launcher.daemon.pid(), SIGCONT);
         if (waits) {
             std::this_thread::sleep_for(std::chrono::milliseconds(300));
-            EXPECT_EQ(contentOf(output), "");
+            EXPECT_EQ(run.said(), "");
             ASSERT_TRUE(launcher.daemon.client().deleteContainer(2, 501, notes, false));
             ::unlink(file.c_str());
             ::flock(held, LOCK_UN);
         }
-        EXPECT_EQ(run.end(), waits ? 0 : 125);
+        EXPECT_EQ(run.wait(), waits ? 0 : 125) << run.said();
         ::close(held);
+        if (waits) {
+            const std::string fresh = launcher.data(notes);
+            EXPECT_NE(fresh, old);
+            EXPECT_EQ(run.said(), fresh + "\n");
+        }
     }
-    const std::string fresh = launcher.data(notes);
-    EXPECT_NE(fresh, old);
-    EXPECT_EQ(contentOf(output), fresh + "\n");
 }
-
-} // namespace
 
 // Goal: whatever keeps a program from being run is 125 and says what to do. Method: a table of command lines, the last
 // of them against a root without a daemon.
 TEST(Run, CommandLines) {
     const support::TemporaryDirectory empty;
-    const Words whole = {"--identifier", "a.b", "--user", "501"};
+    const auto withUser = [](const char* user) { return Words{"--identifier", "a.b", "--user", user, "sh"}; };
     struct Row {
         Words words;
         int exitCode;
@@ -232,11 +177,11 @@ TEST(Run, CommandLines) {
         {{}, 125, "--identifier is missing"},
         {{"--identifier", "", "--user", "501", "sh"}, 125, "--identifier is missing"},
         {{"--identifier", "a.b", "sh"}, 125, "--user is missing"},
-        {{"--identifier", "a.b", "--user", "0", "sh"}, 125, "'0' is no user"},
-        {{"--identifier", "a.b", "--user", "1", "sh"}, 125, "'1' is no user"},
-        {{"--identifier", "a.b", "--user", "501x", "sh"}, 125, "'501x' is no user"},
-        {{"--identifier", "a.b", "--user", "4294967295", "sh"}, 125, "is no user"},
-        {{"--identifier", "a.b", "--user", "4294967797", "sh"}, 125, "is no user"},
+        {withUser("0"), 125, "'0' is no user"},
+        {withUser("1"), 125, "'1' is no user"},
+        {withUser("501x"), 125, "'501x' is no user"},
+        {withUser("4294967295"), 125, "is no user"},
+        {withUser("4294967797"), 125, "is no user"},
         {{"--identifier", "a.b", "--user", "501", "--"}, 125, "no program"},
         {{"--identifier", "a.b", "--user", "501", ""}, 125, "no program"},
         {{"--identifier", "a.b", "--user"}, 125, "needs a value"},
@@ -316,8 +261,8 @@ TEST(Run, ItsOwnContainersAndNothingElse) {
     ::setenv("LC_ALL", "C.UTF-8", 1);
     const int inherited = ::open("/", O_PATH | O_DIRECTORY); // a way out, were it passed on
     std::string script;
-    for (std::size_t i = 0; i < std::size(conditions); ++i)
-        script += "{ " + conditions[i] + "; } >$TMPDIR/out 2>&1 || echo failed " + std::to_string(i) + "\n";
+    for (const std::string& condition : conditions)
+        script += "{ " + condition + "; } >$TMPDIR/out 2>&1 || cat <<'END'\nfailed: " + condition + "\nEND\n";
     for (const char* space : {"pid", "ipc", "mnt", "uts"}) {
         const std::string link = std::string("/proc/self/ns/") + space;
         script += "test \"$(readlink " + link + ")\" != '" + files::read_symlink(link).string() + "' || echo shares " +
@@ -328,12 +273,8 @@ TEST(Run, ItsOwnContainersAndNothingElse) {
     ::unsetenv("ZORVANE_TEST_SECRET");
     EXPECT_EQ(outcome.exitStatus, 0);
     EXPECT_EQ(outcome.output, "");
-    std::istringstream lines(outcome.output);
-    for (std::string word; lines >> word;)
-        if (std::size_t index = 0; word == "failed" && lines >> index)
-            ADD_FAILURE() << conditions[index];
-    EXPECT_EQ(contentOf(home + "/Documents/mine"), "mine\n");
-    EXPECT_EQ(contentOf(shared + "/Library/ours"), "ours\n");
+    EXPECT_EQ(readFile(home + "/Documents/mine"), "mine\n");
+    EXPECT_EQ(readFile(shared + "/Library/ours"), "ours\n");
     // The other one shares the group, and nothing more.
     EXPECT_EQ(launcher.shell(maps, "cat " + shared + "/Library/ours").output, "ours\n");
     EXPECT_NE(launcher.shell(maps, "cat " + home + "/Documents/mine").exitStatus, 0);
@@ -348,7 +289,6 @@ TEST(Run, ExitCodesAndSignals) {
         Words words;
         int exitCode;
     };
-    const std::string notExecutable = "/etc/passwd";
     const Row rows[] = {
         {{"--", "true"}, 0},
         {{"sh", "-c", "exit 7"}, 7},
@@ -357,7 +297,7 @@ TEST(Run, ExitCodesAndSignals) {
         {{"--", "sh", "-c", "kill -KILL $$"}, 128 + SIGKILL},
         {{"--", "no-such-program"}, 127},
         {{"--", "/no/such/program"}, 127},
-        {{"--", notExecutable}, 126},
+        {{"--", "/etc/passwd"}, 126},
         {{"--", "/usr"}, 126},
         {{"--bubblewrap", "/nowhere", "--", "true"}, 125},
         {{"--bubblewrap", "/bin/false", "--", "true"}, 125},
@@ -372,48 +312,46 @@ TEST(Run, ExitCodesAndSignals) {
     careless.insert(careless.end(), exits.begin(), exits.end());
     EXPECT_EQ(runProgram(careless).exitStatus, 9) << "from a caller that does not wait for its children";
     const std::string ready = launcher.data(notes) + "/ready";
-    const std::string output = launcher.daemon.path("output");
     const std::string wait = "touch $HOME/ready; while :; do sleep 0.02; done";
-    struct Signal {
+    // Sends a signal once the file is there.
+    const auto signalled = [&](const Words& words, int signal) {
+        files::remove(ready);
+        Program run(launcher.words(notes, words));
+        EXPECT_TRUE(waitUntil([&] { return files::exists(ready); }));
+        run.signal(signal);
+        const int exitCode = run.wait();
+        return Outcome{exitCode, run.said()};
+    };
+    const struct {
         int number;
         std::string script;
         int exitCode;
         const char* says;
-    };
-    const Signal signals[] = {
+    } signals[] = {
         {SIGTERM, "trap 'echo term; exit 3' TERM; ", 3, "term\n"},
         {SIGINT, "trap 'echo int; exit 4' INT; ", 4, "int\n"},
         {SIGUSR1, "trap 'echo usr1; exit 5' USR1; ", 5, "usr1\n"},
         {SIGTERM, "", 128 + SIGTERM, ""},
         {SIGHUP, "", 128 + SIGHUP, ""},
     };
-    for (const Signal& signal : signals) {
-        files::remove(ready);
-        Background run(launcher.words(notes, {"--", "sh", "-c", signal.script + wait}), output);
-        ASSERT_TRUE(waitUntil([&] { return files::exists(ready); }));
-        ::kill(run.pid(), signal.number);
-        EXPECT_EQ(run.end(), signal.exitCode) << signal.number;
-        EXPECT_EQ(contentOf(output), signal.says);
+    for (const auto& row : signals) {
+        const auto outcome = signalled({"--", "sh", "-c", row.script + wait}, row.number);
+        EXPECT_EQ(outcome.exitStatus, row.exitCode) << row.number;
+        EXPECT_EQ(outcome.output, row.says);
     }
     // A signal that comes before there is a program ends the program at its beginning.
-    files::remove(ready);
     const std::string maker = launcher.daemon.path("maker");
     writeFile(maker, "#!/bin/sh\ntouch " + ready + "\nsleep 0.3\nexec /usr/bin/bwrap \"$@\"\n", 0755);
-    {
-        Background run(launcher.words(notes, {"--bubblewrap", maker, "--", "sleep", "60"}), output);
-        ASSERT_TRUE(waitUntil([&] { return files::exists(ready); }));
-        ::kill(run.pid(), SIGTERM);
-        EXPECT_EQ(run.end(), 128 + SIGTERM);
-    }
+    EXPECT_EQ(signalled({"--bubblewrap", maker, "--", "sleep", "60"}, SIGTERM).exitStatus, 128 + SIGTERM);
     // A lock that only the program holds is free again when the launcher was killed.
     files::remove(ready);
-    Background run(launcher.words(notes, {"--", "sh", "-c", "exec 9>$HOME/held; flock 9; " + wait}), output);
+    Program run(launcher.words(notes, {"--", "sh", "-c", "exec 9>$HOME/held; flock 9; " + wait}));
     ASSERT_TRUE(waitUntil([&] { return files::exists(ready); }));
-    const std::string held = launcher.data(notes) + "/held";
-    ASSERT_NE(runProgram({"/usr/bin/flock", "-n", held, "true"}).exitStatus, 0);
-    ::kill(run.pid(), SIGKILL);
-    EXPECT_EQ(run.end(), -SIGKILL);
-    EXPECT_TRUE(waitUntil([&] { return runProgram({"/usr/bin/flock", "-n", held, "true"}).exitStatus == 0; }));
+    const Words free = {"/usr/bin/flock", "-n", launcher.data(notes) + "/held", "true"};
+    ASSERT_NE(runProgram(free).exitStatus, 0);
+    run.signal(SIGKILL);
+    EXPECT_EQ(run.wait(), 128 + SIGKILL);
+    EXPECT_TRUE(waitUntil([&] { return runProgram(free).exitStatus == 0; }));
 }
 
 // Goal: nothing is used that is not registered, and the error says how to register it. Method: a table of choices, the
@@ -503,7 +441,7 @@ TEST(Run, AContainerSwappedAfterTheCheck) {
                   0755);
         const auto outcome = launcher.run(notes, {"--bubblewrap", maker, "--", "cat", home + "/which"});
         EXPECT_EQ(outcome.output, "container") << swap;
-        EXPECT_EQ(contentOf(home + "/which"), "elsewhere") << "the swap took place";
+        EXPECT_EQ(readFile(home + "/which"), "elsewhere") << "the swap took place";
     }
 }
 

@@ -2,6 +2,7 @@
 #include "world/World.h"
 
 #include "plist/Binary.h"
+#include "plist/Read.h"
 
 #include <algorithm>
 #include <cstdio>
@@ -110,6 +111,36 @@ std::shared_ptr<ZORClientConnection> World::client(ZORClientConnection::Client c
     return std::make_shared<ZORClientConnection>(composition_->store(), std::move(client));
 }
 
+void World::boot() {
+    daemonsClient().rebootContainerManagerSetup();
+    launch();
+}
+
+void World::launch() {
+    daemonsClient().containerManagerSetup();
+    drainDeathRow();
+}
+
+ErrorCode World::pass() {
+    std::promise<ErrorCode> code;
+    daemonsClient().deleteContainersOnDeathRowWithCompletion([&](ErrorCode c) { code.set_value(c); });
+    const ErrorCode result = code.get_future().get();
+    drainDeathRow();
+    return result;
+}
+
+Result<FoundContainer> World::create(const std::string& identifier, ContainerClass containerClass, bool transient,
+                                     std::optional<std::uint32_t> userId) {
+    return daemonsClient().createOrLookupContainerForUser(userId.value_or(ownerOf(containerClass)), &identifier,
+                                                          containerClass,
+                                                          {.createIfNecessary = true, .transient = transient});
+}
+
+Result<FoundContainer> World::find(const std::string& identifier, ContainerClass containerClass, bool transient) {
+    return daemonsClient().createOrLookupContainerForUser(ownerOf(containerClass), &identifier, containerClass,
+                                                          {.transient = transient});
+}
+
 void World::drainDeathRow() {
     std::promise<void> reached;
     platform_->roles().deathRowQueue.async([&] { reached.set_value(); });
@@ -148,6 +179,12 @@ std::string World::read(std::string_view relative) const {
     return {std::istreambuf_iterator<char>(file), {}};
 }
 
+plist::Dictionary World::readDictionary(std::string_view relative) const {
+    const std::string bytes = read(relative);
+    const auto value = plist::readPropertyList({reinterpret_cast<const std::uint8_t*>(bytes.data()), bytes.size()});
+    return value && value->asDictionary() ? *value->asDictionary() : plist::Dictionary();
+}
+
 std::vector<std::string> World::names(std::string_view relative) const {
     std::vector<std::string> found;
     if (DIR* directory = ::opendir(path(relative).c_str())) {
@@ -161,10 +198,9 @@ std::vector<std::string> World::names(std::string_view relative) const {
 }
 
 std::vector<std::string> World::deathRow() const {
-    const std::string row = std::string(cachesPath) + "/Dead";
     std::vector<std::string> found;
-    for (const std::string& unique : names(row))
-        for (std::string& name : names(row + "/" + unique))
+    for (const std::string& unique : names(dead))
+        for (std::string& name : names(dead + "/" + unique))
             found.push_back(std::move(name));
     std::ranges::sort(found);
     return found;
@@ -173,6 +209,30 @@ std::vector<std::string> World::deathRow() const {
 void World::putContainer(std::string_view relative, const plist::Dictionary& metadata) const {
     makeDirectories(relative);
     write(std::string(relative) + "/" + names::metadataFile, binary(metadata));
+}
+
+void World::refuse(support::DiskCall call, int error, support::FaultSpan span) {
+    faults_.arm({.error = error, .span = span, .filter = [call](const support::DiskCallInfo& info) {
+                     return info.call == call;
+                 }});
+}
+
+std::vector<std::string> World::complaints(std::string_view function) {
+    std::vector<std::string> messages = log.take(3, function);
+    std::ranges::transform(messages, messages.begin(), support::withoutSourceLine);
+    return messages;
+}
+
+std::uint32_t ownerOf(ContainerClass containerClass) {
+    return isBundleClass(containerClass) ? 33 : isSystemClass(containerClass) ? 499 : mobile;
+}
+
+std::string nameOf(const std::string& path) {
+    return path.substr(path.rfind('/') + 1);
+}
+
+std::string parentOf(const std::string& path) {
+    return path.substr(0, path.rfind('/'));
 }
 
 plist::Dictionary metadataOf(std::uint64_t containerClass, std::uint32_t userId, const std::string& identifier,

@@ -17,16 +17,20 @@
 #include "support/RecordingLog.h"
 
 #include <atomic>
+#include <functional>
 #include <memory>
 #include <string>
 #include <string_view>
 #include <sys/stat.h>
+#include <thread>
 #include <vector>
 
 namespace zor::test {
 
 inline constexpr std::uint32_t mobile = 501;
 inline constexpr std::uint32_t second = 502;
+inline constexpr ContainerClass application = ContainerClass::dataApplication;
+inline constexpr bool asTransient = true;
 
 class SettableBuild final : public platform::InternalBuildQuery {
 public:
@@ -121,15 +125,33 @@ public:
     /// A client of one message.
     [[nodiscard]] std::shared_ptr<ZORClientConnection> client(ZORClientConnection::Client client);
     [[nodiscard]] platform::LinuxPlatform& linux() { return *platform_; }
+    /// What a boot does before it serves; a launch without one does the second half.
+    void boot();
+    void launch();
     /// Waits until everything queued for death row has run.
     void drainDeathRow();
+    /// The code of one deletion pass.
+    ErrorCode pass();
+
+    // Containers, by the daemon's own client; of mobile where the class does not say whose they are.
+    Result<FoundContainer> create(const std::string& identifier, ContainerClass containerClass = application,
+                                  bool transient = false, std::optional<std::uint32_t> userId = {});
+    Result<FoundContainer> find(const std::string& identifier, ContainerClass containerClass = application,
+                                bool transient = false);
+    FoundContainer make(const std::string& identifier, ContainerClass containerClass = application,
+                        bool transient = false, std::optional<std::uint32_t> userId = {}) {
+        return create(identifier, containerClass, transient, userId).value();
+    }
 
     // The disk below the root; paths are relative to it.
     [[nodiscard]] std::string path(std::string_view relative = "") const;
     [[nodiscard]] FileURL url(std::string_view relative) const { return FileURL::directory(path(relative)); }
+    [[nodiscard]] std::string relative(const std::string& absolute) const { return absolute.substr(path().size() + 1); }
     void makeDirectories(std::string_view relative, std::uint32_t owner = 0, mode_t mode = 0755) const;
     void write(std::string_view relative, std::string_view bytes, mode_t mode = 0644) const;
     [[nodiscard]] std::string read(std::string_view relative) const;
+    /// Empty when there is none.
+    [[nodiscard]] plist::Dictionary readDictionary(std::string_view relative) const;
     [[nodiscard]] std::string item(std::string_view relative) const { return itemAt(path(relative)); }
     [[nodiscard]] bool exists(std::string_view relative) const { return item(relative) != "missing"; }
     /// Names in a directory, hidden ones too, sorted.
@@ -147,6 +169,10 @@ public:
     CountingQueue lockStateQueue;
     FailingSandbox sandbox;
     support::FaultDisk& disk() { return faults_; }
+    /// The disk refuses calls of one kind until it is disarmed.
+    void refuse(support::DiskCall call, int error, support::FaultSpan span = support::FaultSpan::once);
+    /// The level-3 messages of a function since the last look at the log, without their source lines.
+    std::vector<std::string> complaints(std::string_view function);
     /// Classes under the lock state in the test's hand.
     platform::XattrProtectionClass& protection() { return *protection_; }
 
@@ -167,6 +193,38 @@ plist::Dictionary metadataOf(std::uint64_t containerClass, std::uint32_t userId,
                              const std::string& uuid = "00000000-0000-4000-8000-000000000001");
 std::string binary(const plist::Value& value);
 
+/// The user whose containers of a class the tests make.
+std::uint32_t ownerOf(ContainerClass containerClass);
+std::string nameOf(const std::string& path);
+std::string parentOf(const std::string& path);
+inline bool isThere(const std::string& path) {
+    return itemAt(path) != "missing";
+}
+
+/// Of one of the system's errors the code is negative.
+inline ErrorCode codeOf(const ZORError& error) {
+    return error.domain() == ErrorDomain::zor ? error.replyCode() : static_cast<ErrorCode>(-error.code());
+}
+template <typename T>
+ErrorCode codeOf(const Result<T>& result) {
+    return result ? ErrorCode::success : codeOf(result.error());
+}
+/// The code and the description: "11 Can't act on". Empty for a success.
+template <typename T>
+std::string complaintOf(const Result<T>& result) {
+    return result ? ""
+                  : std::to_string(static_cast<std::int64_t>(codeOf(result))) + " " +
+                        result.error().description().value_or("(null)");
+}
+
+/// Runs body(0) to body(count - 1) at once, each on a thread of its own.
+template <typename Body>
+void inParallel(int count, Body body) {
+    std::vector<std::jthread> threads;
+    for (int i = 0; i < count; ++i)
+        threads.emplace_back([&body, i] { body(i); });
+}
+
 inline constexpr const char* cachesPath = "private/var/root/Library/Caches/com.veltra.zorvaned";
 inline constexpr const char* libraryPath = "private/var/root/Library/Zorvane";
 /// On any device that has been booted: no group identifiers of an older system wait in containers.
@@ -174,5 +232,11 @@ inline constexpr const char* groupMarkerPath = "private/var/root/Library/Zorvane
 inline constexpr const char* sharedPath = "private/var/containers";
 inline constexpr const char* mobileContainers = "private/var/mobile/Containers";
 inline constexpr const char* mobileCaches = "private/var/mobile/Containers/Library/Caches/com.veltra.zorvaned";
+inline const std::string applications = std::string(mobileContainers) + "/Data/Application";
+inline const std::string transients = std::string(mobileCaches) + "/Temp/Data/Application";
+inline const std::string staging = std::string(cachesPath) + "/Staging";
+inline const std::string dead = std::string(cachesPath) + "/Dead";
+inline const std::string journals = std::string(libraryPath) + "/Replace";
+inline const std::string entitlementFile = std::string(libraryPath) + "/zor_entitlements.plist";
 
 } // namespace zor::test

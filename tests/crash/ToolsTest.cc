@@ -1,0 +1,346 @@
+// SPDX-License-Identifier: Apache-2.0
+// Goal: the tools that inject faults and cut the power tell what is sound from what is wrong. Method: small ways to
+// change a disk, some known to be wrong.
+#include "platform/linux/LinuxDisk.h"
+#include "support/FaultLoop.h"
+#include "support/Files.h"
+#include "support/PowerCut.h"
+#include "support/ProcessResources.h"
+
+#include <algorithm>
+#include <csignal>
+#include <fcntl.h>
+#include <functional>
+#include <future>
+#include <gtest/gtest.h>
+#include <memory>
+#include <sys/resource.h>
+#include <thread>
+#include <unistd.h>
+
+namespace zor::support {
+namespace {
+
+using platform::FileDescriptor;
+using platform::LinuxDisk;
+
+constexpr mode_t newMode = 0644;
+const std::string oldContent = "old content";
+const std::string newContent = "the new content, which is longer";
+
+/// Gives the file "f" of a directory the new content through the file ".t", which goes when it is left.
+struct Replacing {
+    platform::Disk& disk;
+    int directory;
+    FileDescriptor file = {};
+    bool hasTemporary = false;
+
+    ~Replacing() {
+        if (hasTemporary)
+            disk.unlinkFile(directory, ".t");
+    }
+};
+
+/// One step of it; a negative errno when it fails.
+using Step = int (*)(Replacing&);
+int createWithMode(Replacing& work, mode_t mode) {
+    work.file.reset(work.disk.createFile(work.directory, ".t", mode));
+    work.hasTemporary = work.file.valid();
+    return work.file.get();
+}
+constexpr Step createTemporary = [](Replacing& work) { return createWithMode(work, newMode); };
+constexpr Step createClosed = [](Replacing& work) { return createWithMode(work, 0600); };
+constexpr Step createInPlace = [](Replacing& work) {
+    work.file.reset(::openat(work.directory, "f", O_RDWR | O_CLOEXEC));
+    return work.file.get();
+};
+constexpr Step renameOver = [](Replacing& work) {
+    const int result = work.disk.rename(work.directory, ".t", work.directory, "f", 0);
+    work.hasTemporary = work.hasTemporary && result != 0;
+    return result;
+};
+constexpr Step syncBystander = [](Replacing& work) {
+    const FileDescriptor bystander(::openat(work.directory, "bystander", O_RDONLY | O_CLOEXEC));
+    return work.disk.sync(bystander.get());
+};
+constexpr Step writeNew = [](Replacing& work) { return work.disk.write(work.file.get(), bytesOf(newContent)); };
+constexpr Step setMode = [](Replacing& work) { return work.disk.changeMode(work.file.get(), newMode); };
+constexpr Step syncFile = [](Replacing& work) { return work.disk.sync(work.file.get()); };
+constexpr Step orderFile = [](Replacing& work) { return work.disk.orderData(work.file.get()); };
+constexpr Step syncDirectory = [](Replacing& work) { return work.disk.sync(work.directory); };
+constexpr Step syncAll = [](Replacing& work) { return work.disk.syncFileSystem(work.directory); };
+constexpr Step unlinkOld = [](Replacing& work) { return work.disk.unlinkFile(work.directory, "f"); };
+
+/// The first error ends it.
+int runSteps(platform::Disk& disk, int directory, const std::vector<Step>& steps) {
+    Replacing work{disk, directory};
+    int result = 0;
+    for (auto step = steps.begin(); step != steps.end() && result >= 0; ++step)
+        result = (*step)(work);
+    return std::min(result, 0);
+}
+
+std::string text(const Bytes& bytes) {
+    return {bytes.begin(), bytes.end()};
+}
+
+struct World {
+    explicit World(FaultDisk& faultDisk) : disk(faultDisk), directory(openDirectory(root.path())) {
+        makeFile(directory.get(), "f", oldContent, newMode);
+    }
+
+    TemporaryDirectory root;
+    FaultDisk& disk;
+    FileDescriptor directory;
+    int result = 0;
+};
+
+const std::vector<Step> soundSteps = {createTemporary, writeNew, syncFile, renameOver, syncDirectory};
+const std::vector<Step> inPlace = {createInPlace, writeNew, syncFile};
+
+LoopReport replaceWithFaults(const Fault& fault, const std::vector<Step>& steps) {
+    LinuxDisk linuxDisk;
+    return forEachFaultPoint(
+        linuxDisk, fault, [](FaultDisk& disk) { return std::make_unique<World>(disk); },
+        [&](const std::unique_ptr<World>& world) {
+            world->result = runSteps(world->disk, world->directory.get(), steps);
+        },
+        [](const std::unique_ptr<World>& world, const FaultOutcome& outcome) -> std::string {
+            const FileTree tree = readTree(world->root.path());
+            const std::string content = text(tree.inodes.at(tree.resolve("f")).content);
+            if (content != oldContent && content != newContent)
+                return "f holds \"" + content + "\"";
+            if (!outcome.met && content != newContent)
+                return "nothing failed, yet the old content is there";
+            if (outcome.stopped || !outcome.met)
+                return "";
+            if (world->result != -outcome.fault.error)
+                return "the error was not returned";
+            const bool cleaned = tree.resolve(".t") == 0 || outcome.fault.span == FaultSpan::fromThenOn;
+            return cleaned ? "" : ".t was left";
+        });
+}
+
+// Goal: the loop meets each point once and a sound protocol stands all kinds, a wrong one none.
+// Method: create, two halves of a write, two syncs and a rename are six points, and one run more meets none.
+TEST(FaultDiskTest, LoopsOverEveryPoint) {
+    const std::vector<Fault> faults = {{.kind = FaultKind::error, .error = EIO},
+                                       {.kind = FaultKind::error, .error = ENOSPC, .span = FaultSpan::fromThenOn},
+                                       {.kind = FaultKind::stop},
+                                       {.kind = FaultKind::exit}};
+    for (const Fault& fault : faults) {
+        SCOPED_TRACE(fault.describe());
+        const ProcessResources before;
+        const LoopReport good = replaceWithFaults(fault, soundSteps);
+        EXPECT_EQ(good.complaint, "");
+        EXPECT_EQ(good.examined, 7U);
+        const LoopReport bad = replaceWithFaults(fault, inPlace);
+        EXPECT_NE(bad.complaint.find("fault point 2 "), std::string::npos) << bad.complaint;
+        EXPECT_EQ(before.leakedSince(), "");
+    }
+}
+
+// Goal: a stopped process changes nothing any more, whether its clean-up runs in a handler, a destructor or another
+// thread. Method: each kind tries to remove a file after the stop.
+TEST(FaultDiskTest, StaysStopped) {
+    LinuxDisk linuxDisk;
+    FaultDisk disk(linuxDisk);
+    World world(disk);
+    const auto cleanUp = [&] { return disk.unlinkFile(world.directory.get(), "f"); };
+    disk.arm({.point = 1, .kind = FaultKind::stop});
+    int insideDestructor = 0;
+    try {
+        struct AtEnd {
+            std::function<void()> run;
+            ~AtEnd() { run(); }
+        } const atEnd{[&] { insideDestructor = cleanUp(); }};
+        try {
+            disk.sync(world.directory.get());
+        } catch (const std::exception&) {
+            ADD_FAILURE() << "a handler of the daemon's own errors takes it";
+        } catch (...) {
+            EXPECT_THROW(cleanUp(), ProcessStopped);
+            throw;
+        }
+    } catch (const ProcessStopped&) {
+    }
+    EXPECT_EQ(insideDestructor, -EIO);
+    std::thread([&] { EXPECT_THROW(cleanUp(), ProcessStopped); }).join();
+    disk.disarm();
+    EXPECT_THROW(cleanUp(), ProcessStopped) << "disarming raises no dead";
+    EXPECT_TRUE(exists(world.directory.get(), "f"));
+}
+
+// Goal: a leak is seen. Method: hold a descriptor and a thread.
+TEST(ProcessResourcesTest, SeesLeaks) {
+    const ProcessResources before;
+    EXPECT_EQ(before.leakedSince(), "");
+    FileDescriptor held(::open("/dev/null", O_RDONLY | O_CLOEXEC));
+    EXPECT_NE(before.leakedSince().find("/dev/null"), std::string::npos);
+    held.reset();
+    std::promise<void> end;
+    std::thread waiting([&] { end.get_future().wait(); });
+    EXPECT_EQ(before.leakedSince(), "1 threads; ");
+    end.set_value();
+    waiting.join();
+    EXPECT_EQ(before.leakedSince(), "");
+}
+
+// Goal: protocols that are known to be wrong are caught and sound ones pass, each under the model that can tell.
+// Method: a table of step lists, recorded on a real directory; after a cut "f" must hold the old or, when acknowledged,
+// the new content, with its mode.
+struct Protocol {
+    const char* name;
+    std::vector<Step> steps;
+    bool soundOrdered;
+    bool soundUnordered;
+};
+
+const std::vector<Protocol> protocols = {
+    {"nothing synced", {createTemporary, writeNew, renameOver}, false, false},
+    {"sound", {createTemporary, writeNew, syncFile, renameOver, syncDirectory}, true, true},
+    {"file not synced", {createTemporary, writeNew, renameOver, syncDirectory}, false, false},
+    {"directory not synced", {createTemporary, writeNew, syncFile, renameOver}, false, false},
+    {"directory synced first", {createTemporary, writeNew, syncFile, syncDirectory, renameOver}, false, false},
+    {"unchanged file synced", {createTemporary, writeNew, syncFile, renameOver, syncBystander}, false, false},
+    {"renamed file synced", {createTemporary, writeNew, syncFile, renameOver, syncFile}, true, false},
+    {"data ordered out", {createTemporary, writeNew, orderFile, renameOver, syncDirectory}, true, false},
+    {"ordered after rename", {createTemporary, writeNew, renameOver, orderFile, syncDirectory}, false, false},
+    {"ordered before write", {createTemporary, orderFile, writeNew, renameOver, syncDirectory}, false, false},
+    {"written in place", {createInPlace, writeNew, syncFile}, false, false},
+    {"unlinked", {createTemporary, writeNew, syncFile, unlinkOld, renameOver, syncDirectory}, false, false},
+    {"mode after sync", {createClosed, writeNew, syncFile, setMode, renameOver, syncDirectory}, true, false},
+    {"mode after rename", {createClosed, writeNew, syncFile, renameOver, setMode, syncDirectory}, false, false},
+    {"file system synced", {createClosed, writeNew, setMode, syncAll, renameOver, syncAll}, true, true},
+};
+
+/// Whether no cut leaves what `judge` complains of, under each model.
+using Judge = std::string (*)(const PowerCutState&, const std::string&);
+void expectSound(const DiskLog& log, Judge judge, bool soundOrdered, bool soundUnordered) {
+    for (const std::uint64_t seed : {1, 2, 3}) {
+        for (const DiskModel model : {DiskModel::orderedJournal, DiskModel::unordered}) {
+            const LoopReport report = forEachPowerCut(log, {.model = model, .seed = seed}, judge);
+            EXPECT_EQ(report.complaint.empty(), model == DiskModel::unordered ? soundUnordered : soundOrdered)
+                << report.complaint;
+            EXPECT_GT(report.examined, 0U);
+        }
+    }
+}
+
+std::string judgeReplacement(const PowerCutState& state, const std::string& directory) {
+    const FileTree tree = readTree(directory);
+    if (tree.describe() != state.tree.describe())
+        return "the state was not built as it is";
+    const InodeId id = tree.resolve("f");
+    if (id == 0)
+        return "f is gone";
+    const Inode& file = tree.inodes.at(id);
+    const std::string content = text(file.content);
+    if (content != oldContent && content != newContent)
+        return "f holds \"" + content + "\"";
+    if (content == newContent && (file.mode & 07777) != newMode)
+        return "f has another mode";
+    return state.marksPassed > 0 && content != newContent ? "the new content was acknowledged and is lost" : "";
+}
+
+TEST(PowerCutModelTest, TellsSoundFromWrong) {
+    for (const Protocol& protocol : protocols) {
+        SCOPED_TRACE(protocol.name);
+        const TemporaryDirectory root;
+        const FileDescriptor directory = openDirectory(root.path());
+        makeFile(directory.get(), "f", oldContent, newMode);
+        makeFile(directory.get(), "bystander", "b", newMode);
+        LinuxDisk linuxDisk;
+        RecordingDisk disk(linuxDisk, root.path());
+        disk.start();
+        ASSERT_EQ(runSteps(disk, directory.get(), protocol.steps), 0);
+        disk.mark();
+        ASSERT_EQ(disk.complaint(), "");
+        expectSound(disk.log(), judgeReplacement, protocol.soundOrdered, protocol.soundUnordered);
+    }
+}
+
+// Goal: the same for a directory that is built aside and moved in whole.
+// Method: each sync left out in turn; the moved directory, where it is, must hold everything.
+struct DirectoryProtocol {
+    const char* name;
+    bool syncContent;
+    bool syncDirectory;
+    bool syncDestination;
+    bool soundOrdered;
+    bool soundUnordered;
+};
+
+const std::vector<DirectoryProtocol> directoryProtocols = {
+    {"sound", true, true, true, true, true},
+    {"content not synced", false, true, true, false, false},
+    // The content's sync commits what was made before it, where a journal keeps the order.
+    {"directory not synced", true, false, true, true, false},
+    {"destination not synced", true, true, false, false, false},
+};
+
+std::string judgeDirectory(const PowerCutState& state, const std::string& directory) {
+    const FileTree tree = readTree(directory);
+    if (tree.resolve("class/u") == 0)
+        return state.marksPassed > 0 ? "what was acknowledged is lost" : "";
+    if (tree.resolve("staging/u") != 0)
+        return "in both places";
+    const InodeId meta = tree.resolve("class/u/meta");
+    if (tree.resolve("class/u/sub") == 0 || meta == 0)
+        return "half made";
+    return text(tree.inodes.at(meta).content) == newContent ? "" : "content lost";
+}
+
+TEST(PowerCutDirectoryTest, TellsSoundFromWrong) {
+    for (const DirectoryProtocol& protocol : directoryProtocols) {
+        SCOPED_TRACE(protocol.name);
+        const TemporaryDirectory root;
+        for (const char* name : {"/staging", "/class"})
+            makeDirectory(AT_FDCWD, root.path() + name);
+        const FileDescriptor staging = openDirectory(root.path() + "/staging");
+        const FileDescriptor destination = openDirectory(root.path() + "/class");
+        LinuxDisk linuxDisk;
+        RecordingDisk disk(linuxDisk, root.path());
+        disk.start();
+        ASSERT_EQ(disk.makeDirectory(staging.get(), "u", 0755), 0);
+        const FileDescriptor made = openDirectory(root.path() + "/staging/u");
+        ASSERT_EQ(disk.makeDirectory(made.get(), "sub", 0755), 0);
+        const FileDescriptor meta(disk.createFile(made.get(), "meta", 0644));
+        ASSERT_EQ(disk.write(meta.get(), bytesOf(newContent)), 0);
+        ASSERT_TRUE(!protocol.syncContent || disk.sync(meta.get()) == 0);
+        ASSERT_TRUE(!protocol.syncDirectory || disk.sync(made.get()) == 0);
+        ASSERT_EQ(disk.rename(staging.get(), "u", destination.get(), "u", 0), 0);
+        ASSERT_TRUE(!protocol.syncDestination || disk.sync(destination.get()) == 0);
+        disk.mark();
+        ASSERT_EQ(disk.complaint(), "");
+        expectSound(disk.log(), judgeDirectory, protocol.soundOrdered, protocol.soundUnordered);
+    }
+}
+
+// Goal: the recorder cannot be passed by. Method: a write that the kernel ends in the middle, and changes around it.
+TEST(RecordingDiskTest, FindsWhatItWasNotTold) {
+    const TemporaryDirectory root;
+    const FileDescriptor top = openDirectory(root.path());
+    LinuxDisk linuxDisk;
+    RecordingDisk disk(linuxDisk, root.path());
+    disk.start();
+    const FileDescriptor file(disk.createFile(top.get(), "f", 0600));
+    struct rlimit before = {};
+    ASSERT_EQ(::getrlimit(RLIMIT_FSIZE, &before), 0);
+    const struct rlimit small = {.rlim_cur = 3, .rlim_max = before.rlim_max};
+    const auto handler = std::signal(SIGXFSZ, SIG_IGN);
+    ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &small), 0);
+    EXPECT_EQ(disk.write(file.get(), Bytes{1, 2, 3, 4, 5}), -EFBIG);
+    ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &before), 0);
+    std::signal(SIGXFSZ, handler);
+    EXPECT_EQ(disk.complaint(), "") << "the first three bytes are recorded";
+    makeDirectory(top.get(), "unseen", 0700);
+    EXPECT_NE(disk.complaint(), "");
+    ASSERT_EQ(::unlinkat(top.get(), "unseen", AT_REMOVEDIR), 0);
+    EXPECT_EQ(disk.complaint(), "");
+    ASSERT_EQ(::fchmod(file.get(), 0666), 0);
+    EXPECT_NE(disk.complaint(), "");
+}
+
+} // namespace
+} // namespace zor::support

@@ -1,0 +1,91 @@
+// SPDX-License-Identifier: Apache-2.0
+// A Disk before another one that brings all calls to one place, which may refuse them, make them or watch them.
+#pragma once
+
+#include "platform/Disk.h"
+#include "support/DiskCall.h"
+
+#include <functional>
+
+namespace zor::support {
+
+class InterceptedDisk : public platform::Disk {
+public:
+    explicit InterceptedDisk(platform::Disk& inner) : inner_(inner) {}
+
+    int makeDirectory(int directory, const char* name, mode_t mode) override {
+        return pass({DiskCall::makeDirectory, name, directory},
+                    [&] { return inner_.makeDirectory(directory, name, mode); });
+    }
+    int createFile(int directory, const char* name, mode_t mode) override {
+        return pass({DiskCall::createFile, name, directory}, [&] { return inner_.createFile(directory, name, mode); });
+    }
+    int makeSymbolicLink(const char* target, int directory, const char* name) override {
+        return pass({DiskCall::makeSymbolicLink, name, directory},
+                    [&] { return inner_.makeSymbolicLink(target, directory, name); });
+    }
+    int makeHardLink(int fromDirectory, const char* from, int toDirectory, const char* to) override {
+        return pass({DiskCall::makeHardLink, std::string(from) + " -> " + to, fromDirectory},
+                    [&] { return inner_.makeHardLink(fromDirectory, from, toDirectory, to); });
+    }
+    int makeFifo(int directory, const char* name, mode_t mode) override {
+        return pass({DiskCall::makeFifo, name, directory}, [&] { return inner_.makeFifo(directory, name, mode); });
+    }
+    int rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) override {
+        return pass({DiskCall::rename, std::string(from) + " -> " + to, fromDirectory},
+                    [&] { return inner_.rename(fromDirectory, from, toDirectory, to, flags); });
+    }
+    int unlinkFile(int directory, const char* name) override {
+        return pass({DiskCall::unlinkFile, name, directory}, [&] { return inner_.unlinkFile(directory, name); });
+    }
+    int removeDirectory(int directory, const char* name) override {
+        return pass({DiskCall::removeDirectory, name, directory},
+                    [&] { return inner_.removeDirectory(directory, name); });
+    }
+    int changeMode(int fd, mode_t mode) override {
+        return pass({DiskCall::changeMode, "", fd}, [&] { return inner_.changeMode(fd, mode); });
+    }
+    int changeOwner(int fd, uid_t uid, gid_t gid) override {
+        return pass({DiskCall::changeOwner, "", fd}, [&] { return inner_.changeOwner(fd, uid, gid); });
+    }
+    int setTimes(int fd, const timespec& access, const timespec& modification) override {
+        return pass({DiskCall::setTimes, "", fd}, [&] { return inner_.setTimes(fd, access, modification); });
+    }
+    int setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) override {
+        return pass({DiskCall::setAttribute, name, fd}, [&] { return inner_.setAttribute(fd, name, value); });
+    }
+    int setInodeFlags(int fd, int flags) override {
+        return pass({DiskCall::setInodeFlags, "", fd}, [&] { return inner_.setInodeFlags(fd, flags); });
+    }
+    int write(int fd, std::span<const std::uint8_t> bytes) override {
+        return pass({DiskCall::write, "", fd}, [&] { return inner_.write(fd, bytes); });
+    }
+    int cloneData(int from, int to) override {
+        return pass({DiskCall::cloneData, "", from}, [&] { return inner_.cloneData(from, to); });
+    }
+    ssize_t copyData(int from, int to, std::size_t bytesMax) override {
+        return intercept({DiskCall::copyData, "", from}, [&] { return inner_.copyData(from, to, bytesMax); });
+    }
+    int sync(int fd) override {
+        return pass({DiskCall::sync, "", fd}, [&] { return inner_.sync(fd); });
+    }
+    int syncFileSystem(int fd) override {
+        return pass({DiskCall::syncFileSystem, "", fd}, [&] { return inner_.syncFileSystem(fd); });
+    }
+    int orderData(int fd) override {
+        return pass({DiskCall::orderData, "", fd}, [&] { return inner_.orderData(fd); });
+    }
+
+protected:
+    /// `make` makes the call on the inner disk.
+    using Make = std::function<ssize_t()>;
+    virtual ssize_t intercept(const DiskCallInfo& info, const Make& make) = 0;
+    [[nodiscard]] platform::Disk& inner() { return inner_; }
+
+private:
+    int pass(const DiskCallInfo& info, const Make& make) { return static_cast<int>(intercept(info, make)); }
+
+    platform::Disk& inner_;
+};
+
+} // namespace zor::support
