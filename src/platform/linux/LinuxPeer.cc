@@ -9,6 +9,7 @@
 #include <cstring>
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <sys/sysmacros.h>
 #include <unistd.h>
 
 namespace zor::platform {
@@ -59,11 +60,12 @@ Identity LinuxPeer::identify(Explain explain) {
 }
 
 std::expected<FileId, int> LinuxPeer::executable() const {
-    struct stat status{};
-    // The link is one of the kernel's: following it leads to the file that runs, whatever its name is or was.
-    if (::fstatat(accepted_.process.get(), executableLink, &status, 0) != 0)
+    struct statx status{};
+    // The link is one of the kernel's: following it leads to the file that runs, whatever its name is or was. What
+    // tells it apart never changes, so a file system that a server keeps, maybe the peer's own, need not be asked.
+    if (::statx(accepted_.process.get(), executableLink, AT_STATX_DONT_SYNC, STATX_INO, &status) != 0)
         return std::unexpected(errno);
-    return FileId{.device = status.st_dev, .inode = status.st_ino};
+    return FileId{.device = makedev(status.stx_dev_major, status.stx_dev_minor), .inode = status.stx_ino};
 }
 
 LinuxPeer::Judgement LinuxPeer::judge(const IdentityRegistry::Snapshot& snapshot, const FileId& executable) const {
