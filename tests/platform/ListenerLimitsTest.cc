@@ -89,7 +89,9 @@ TEST(ListenerLimits, SharesByUser) {
     limits.connectionsKeptForOwners = 2;
     limits.inputBytesMax = 1000;
     limits.inputBytesMaxPerUser = 400;
+    limits.inputBytesKeptForOwners = 200;
     limits.outputBytesMaxPerUser = 500;
+    limits.outputBytesMaxOfOthers = 700;
     ListenerCharges charges(limits);
     std::vector<ListenerCharges::Account*> accounts;
     const auto open = [&](uid_t uid, bool ownsRoot) {
@@ -117,10 +119,22 @@ TEST(ListenerLimits, SharesByUser) {
     EXPECT_FALSE(charges.changeInput(other, 0, 1));
     EXPECT_FALSE(charges.changeInput(owner, 600, 601));
     EXPECT_TRUE(charges.changeInput(owner, 600, 0));
+    // Others cannot fill what is kept for the owners.
+    ListenerCharges::Account& third = *accounts[6];
+    EXPECT_TRUE(charges.changeInput(other, 0, 399));
+    EXPECT_FALSE(charges.changeInput(third, 0, 2));
+    EXPECT_TRUE(charges.changeInput(third, 0, 1));
+    EXPECT_TRUE(charges.changeInput(owner, 0, 200));
+    EXPECT_TRUE(charges.changeInput(owner, 200, 0));
+    EXPECT_TRUE(charges.changeInput(third, 1, 0));
+    EXPECT_TRUE(charges.changeInput(other, 399, 0));
     EXPECT_TRUE(charges.changeInput(user, 300, 0));
     EXPECT_TRUE(charges.changeInput(user, 100, 0));
     EXPECT_TRUE(charges.changeOutput(user, 0, 500));
     EXPECT_FALSE(charges.changeOutput(user, 0, 1));
+    EXPECT_FALSE(charges.changeOutput(other, 0, 201));
+    EXPECT_TRUE(charges.changeOutput(other, 0, 200));
+    EXPECT_TRUE(charges.changeOutput(other, 200, 0));
     EXPECT_TRUE(charges.changeOutput(owner, 0, 5000));
     EXPECT_TRUE(charges.changeOutput(user, 500, 0));
     EXPECT_TRUE(charges.changeOutput(owner, 5000, 0));

@@ -23,7 +23,8 @@ ListenerCharges::~ListenerCharges() {
     mustHold(totals_.connections == 0, "connections do not balance");
     mustHold(totals_.inputBytes == 0, "input bytes do not balance");
     mustHold(totals_.outputBytes == 0, "output bytes do not balance");
-    mustHold(connectionsOfOthers_ == 0, "connections of others do not balance");
+    mustHold(ofOthers_.connections == 0 && ofOthers_.inputBytes == 0 && ofOthers_.outputBytes == 0,
+             "what others have does not balance");
 }
 
 ListenerCharges::Account* ListenerCharges::openConnection(uid_t uid, bool ownsRoot) {
@@ -33,11 +34,11 @@ ListenerCharges::Account* ListenerCharges::openConnection(uid_t uid, bool ownsRo
     const std::size_t kept = limits_.connectionsKeptForOwners;
     const auto found = accounts_.find(uid);
     if (!ownsRoot) {
-        if (connectionsOfOthers_ + kept >= limits_.connectionsMax)
+        if (ofOthers_.connections + kept >= limits_.connectionsMax)
             return nullptr;
         if (found != accounts_.end() && found->second.connections >= limits_.connectionsMaxPerUser)
             return nullptr;
-        ++connectionsOfOthers_;
+        ++ofOthers_.connections;
     }
     Account& account = found != accounts_.end() ? found->second : accounts_[uid];
     account.uid = uid;
@@ -52,7 +53,7 @@ void ListenerCharges::closeConnection(Account& account) {
     mustHold(account.connections > 0, "a connection is closed twice");
     mustHold(totals_.connections >= account.connections, "a user has more connections than there are");
     if (!account.ownsRoot)
-        --connectionsOfOthers_;
+        --ofOthers_.connections;
     --totals_.connections;
     if (--account.connections > 0)
         return;
@@ -65,11 +66,14 @@ bool ListenerCharges::changeInput(Account& account, std::size_t before, std::siz
     const MutexLock lock(mutex_);
     mustHold(account.inputBytes >= before, "more input bytes are given back than were taken");
     const std::size_t ofUser = account.inputBytes - before + after;
+    const std::size_t ofOthers = account.ownsRoot ? ofOthers_.inputBytes : ofOthers_.inputBytes - before + after;
     const std::size_t inAll = totals_.inputBytes - before + after;
-    const bool tooMuch = inAll > limits_.inputBytesMax || (!account.ownsRoot && ofUser > limits_.inputBytesMaxPerUser);
-    if (after > before && tooMuch)
+    const bool tooMuchOfOthers =
+        ofUser > limits_.inputBytesMaxPerUser || ofOthers + limits_.inputBytesKeptForOwners > limits_.inputBytesMax;
+    if (after > before && (inAll > limits_.inputBytesMax || (!account.ownsRoot && tooMuchOfOthers)))
         return false;
     account.inputBytes = ofUser;
+    ofOthers_.inputBytes = ofOthers;
     totals_.inputBytes = inAll;
     return true;
 }
@@ -78,9 +82,12 @@ bool ListenerCharges::changeOutput(Account& account, std::size_t before, std::si
     const MutexLock lock(mutex_);
     mustHold(account.outputBytes >= before, "more output bytes are given back than were taken");
     const std::size_t ofUser = account.outputBytes - before + after;
-    if (after > before && !account.ownsRoot && ofUser > limits_.outputBytesMaxPerUser)
+    const std::size_t ofOthers = account.ownsRoot ? ofOthers_.outputBytes : ofOthers_.outputBytes - before + after;
+    const bool tooMuchOfOthers = ofUser > limits_.outputBytesMaxPerUser || ofOthers > limits_.outputBytesMaxOfOthers;
+    if (after > before && !account.ownsRoot && tooMuchOfOthers)
         return false;
     account.outputBytes = ofUser;
+    ofOthers_.outputBytes = ofOthers;
     totals_.outputBytes = totals_.outputBytes - before + after;
     return true;
 }

@@ -51,7 +51,8 @@ private:
     mutable Mutex mutex_;
     std::map<uid_t, Account> accounts_ ZOR_GUARDED_BY(mutex_);
     Totals totals_ ZOR_GUARDED_BY(mutex_);
-    std::size_t connectionsOfOthers_ ZOR_GUARDED_BY(mutex_) = 0;
+    /// What those have of it who do not own the root.
+    Totals ofOthers_ ZOR_GUARDED_BY(mutex_);
 };
 
 } // namespace zor::platform

@@ -14,12 +14,14 @@ struct ListenerLimits {
     /// Connections in all, and of any one user that does not own the root.
     std::size_t connectionsMax = 4096;
     std::size_t connectionsMaxPerUser = 1024;
-    /// Of connectionsMax, kept for the owners of the root: four users together cannot lock them out.
+    /// Of connectionsMax, kept for the owners of the root: all users together cannot lock them out.
     std::size_t connectionsKeptForOwners = 64;
 
     /// Bytes of requests that have not arrived whole, in all and of any one user that does not own the root.
     std::size_t inputBytesMax = std::size_t{256} << 20;
     std::size_t inputBytesMaxPerUser = std::size_t{64} << 20;
+    /// Of inputBytesMax, kept for the owners of the root.
+    std::size_t inputBytesKeptForOwners = std::size_t{64} << 20;
 
     /// A connection with this much reply unread is not read from: a peer that never reads cannot make the daemon work.
     std::size_t outputBytesPaused = std::size_t{1} << 20;
@@ -27,6 +29,8 @@ struct ListenerLimits {
     std::size_t outputBytesMax = std::size_t{64} << 20;
     /// Unread replies of all connections of any one user that does not own the root.
     std::size_t outputBytesMaxPerUser = std::size_t{256} << 20;
+    /// The same of all users that do not own the root together.
+    std::size_t outputBytesMaxOfOthers = std::size_t{1} << 30;
 
     /// Requests of one connection that are served in a row before others have their turn.
     unsigned framesPerTurn = 16;
@@ -47,8 +51,10 @@ inline constexpr std::size_t listenerScratchBytes = 32 * 1024;
 inline constexpr std::size_t listenerSmallInputBytes = 4 * 1024;
 
 static_assert(listenerSmallInputBytes + ipc::frameHeaderBytes < listenerScratchBytes);
-// Requests that wait for their turn are kept too. They never fill a user's share, or fairness would drop connections.
+// Requests that wait for their turn are kept too. They never fill a share, or fairness would drop connections.
 static_assert(ListenerLimits{}.connectionsMaxPerUser * listenerScratchBytes < ListenerLimits{}.inputBytesMaxPerUser);
+static_assert(ListenerLimits{}.connectionsMax * listenerScratchBytes + ListenerLimits{}.inputBytesKeptForOwners <
+              ListenerLimits{}.inputBytesMax);
 static_assert(ListenerLimits{}.outputBytesPaused < ListenerLimits{}.outputBytesMax);
 
 } // namespace zor::platform
