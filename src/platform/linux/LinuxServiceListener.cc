@@ -66,6 +66,12 @@ private:
             core_.incidents.happened(ListenerIncident::unknownPeer, errno);
             return core_.charges.closeConnection(*account);
         }
+        // Who connected before the listening socket came to the daemon has not taken it over. What such a one has sent
+        // would come with descriptors in the place of credentials.
+        if (const int error = enableSenderCredentials(socket.get()); error != 0) {
+            core_.incidents.happened(ListenerIncident::unknownPeer, error);
+            return core_.charges.closeConnection(*account);
+        }
         ++core_.accepted;
         core_.unusedConnection()->open(std::move(socket), std::move(peer), *account);
     }
