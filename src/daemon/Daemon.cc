@@ -31,8 +31,7 @@ int Daemon::run() {
         return -1;
     }
     startUp.reset();
-    startListener();
-    if (options_.ready)
+    if (startListener() && options_.ready)
         options_.ready();
     platform.runLoop.run();
     platform.listener.stop();
@@ -110,7 +109,7 @@ bool Daemon::startUpcallServer() {
     return serving;
 }
 
-void Daemon::startListener() {
+bool Daemon::startListener() {
     const platform::Platform& platform = composition_.platform();
     Dispatcher& dispatcher = composition_.dispatcher();
     const bool listening =
@@ -119,6 +118,7 @@ void Daemon::startListener() {
         });
     if (!listening)
         composition_.log().write(logLevelError, "main", "unable to start ipsi service!");
+    return listening;
 }
 
 } // namespace zor

@@ -34,7 +34,8 @@ public:
 
 private:
     bool startUpcallServer();
-    void startListener();
+    /// Without it the daemon serves the upcall alone, and nobody is told that it is ready.
+    bool startListener();
 
     Composition& composition_;
     const Options options_;

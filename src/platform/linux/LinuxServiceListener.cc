@@ -90,29 +90,39 @@ LinuxServiceListener::~LinuxServiceListener() {
 }
 
 bool LinuxServiceListener::resume(ServiceHandler handler) {
-    if (options_.passed.valid()) {
-        socket_ = std::move(options_.passed);
-        if (const int error = adoptListenerSocket(socket_.get(), SOCK_STREAM); error != 0) {
-            errno = error;
-            return false;
-        }
-    } else {
-        auto made = makeListenerSocket(options_.address, SOCK_STREAM, 0666);
-        if (!made) {
-            errno = made.error();
-            return false;
-        }
-        socket_ = std::move(*made);
-        socketIsOurs_ = true;
-    }
-    if (const int error = enableSenderCredentials(socket_.get()); error != 0) {
-        errno = error;
-        return false;
-    }
+    const int error = begin(std::move(handler));
+    if (error == 0)
+        return true;
+    // Clients would get in and wait for ever.
+    stop();
+    errno = error;
+    return false;
+}
+
+int LinuxServiceListener::begin(ServiceHandler handler) {
+    if (const int error = takeSocket(); error != 0)
+        return error;
+    if (const int error = enableSenderCredentials(socket_.get()); error != 0)
+        return error;
     core_ = std::make_unique<ListenerCore>(options_.limits, options_.report);
     core_->handler = std::move(handler);
     acceptance_ = std::make_unique<Acceptance>(socket_.get(), identity_, *core_);
-    return core_->pool.start() && core_->pool.add(socket_.get(), *acceptance_, EPOLLIN);
+    if (!core_->pool.start())
+        return EAGAIN;
+    return core_->pool.add(socket_.get(), *acceptance_, EPOLLIN) ? 0 : errno;
+}
+
+int LinuxServiceListener::takeSocket() {
+    if (options_.passed.valid()) {
+        socket_ = std::move(options_.passed);
+        return adoptListenerSocket(socket_.get(), SOCK_STREAM);
+    }
+    auto made = makeListenerSocket(options_.address, SOCK_STREAM, 0666);
+    if (!made)
+        return made.error();
+    socket_ = std::move(*made);
+    socketIsOurs_ = true;
+    return 0;
 }
 
 void LinuxServiceListener::stop() {

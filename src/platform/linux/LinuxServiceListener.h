@@ -52,7 +52,7 @@ public:
     LinuxServiceListener(PeerIdentity& identity, ListenerOptions options);
     ~LinuxServiceListener() override;
 
-    /// Once. errno tells why when it is false.
+    /// Once. errno tells why when it is false; nobody can connect then.
     bool resume(ServiceHandler handler) override;
     /// Each connection that is still open gets its invalid event from the calling thread. Replies that come later go
     /// nowhere.
@@ -63,6 +63,10 @@ public:
 
 private:
     class Acceptance;
+
+    /// 0 or an errno, and then something may have begun.
+    [[nodiscard]] int begin(ServiceHandler handler);
+    [[nodiscard]] int takeSocket();
 
     PeerIdentity& identity_;
     ListenerOptions options_;
