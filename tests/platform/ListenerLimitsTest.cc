@@ -285,22 +285,6 @@ TEST(ListenerLimits, ASocketPassedToAnotherProcessIsNotThePeer) {
     EXPECT_TRUE(world.isAtRest());
 }
 
-// A hundred requests with a descriptor each: this process, which is both sides, has as many open as before.
-TEST(ListenerLimits, DescriptorsThatAClientSendsAreDropped) {
-    ListenerWorld world;
-    world.limits.threadsRunning = 1;
-    world.limits.threadsMax = 1;
-    world.start();
-    RawClient client = world.connect();
-    EXPECT_TRUE(client.isServed());
-    const support::ProcessResources before;
-    for (std::uint64_t i = 0; i < 100; ++i) {
-        ASSERT_TRUE(sendWithDescriptor(client.socket(), frameOf(numbered(i), i), 0));
-        ASSERT_TRUE(client.receives(i, numbered(i)));
-    }
-    EXPECT_EQ(before.leakedSince(), "");
-}
-
 // Without descriptors connections are refused with a line, the listener does not spin, and it recovers by itself: first
 // its reserve can be used, then nothing.
 TEST(ListenerLimits, OutOfDescriptorsItNeitherSpinsNorDies) {

@@ -153,7 +153,10 @@ TEST(UpcallPort, SurvivesHostilePeers) {
 
     const support::ProcessResources before;
     for (int i = 0; i < 8; ++i) {
-        ASSERT_TRUE(sendWithDescriptor(socket.get(), {'f'}, 0));
+        if (!sendWithDescriptor(socket.get(), {'f'}, 0)) {
+            ASSERT_EQ(errno, EPERM) << "newer kernels refuse it at the sender";
+            continue;
+        }
         EXPECT_TRUE(receive(socket.get()).starts_with("1 "));
     }
     EXPECT_EQ(before.leakedSince(), "");

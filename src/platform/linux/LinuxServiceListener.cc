@@ -51,7 +51,7 @@ public:
 private:
     void arm() { [[maybe_unused]] const bool armed = core_.pool.rearm(socket_, *this, EPOLLIN); }
 
-    void admit(FileDescriptor socket) {
+    void admit(PeerSocket socket) {
         ucred credentials = {};
         socklen_t length = sizeof credentials;
         if (::getsockopt(socket.get(), SOL_SOCKET, SO_PEERCRED, &credentials, &length) != 0)
@@ -114,13 +114,13 @@ int LinuxServiceListener::begin(ServiceHandler handler) {
 
 int LinuxServiceListener::takeSocket() {
     if (options_.passed.valid()) {
-        socket_ = std::move(options_.passed);
+        socket_ = PeerSocket(std::move(options_.passed));
         return adoptListenerSocket(socket_.get(), SOCK_STREAM);
     }
     auto made = makeListenerSocket(options_.address, SOCK_STREAM, 0666);
     if (!made)
         return made.error();
-    socket_ = std::move(*made);
+    socket_ = PeerSocket(std::move(*made));
     socketIsOurs_ = true;
     return 0;
 }

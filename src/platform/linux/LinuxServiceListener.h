@@ -71,7 +71,7 @@ private:
     PeerIdentity& identity_;
     ListenerOptions options_;
     bool socketIsOurs_ = false;
-    FileDescriptor socket_;
+    PeerSocket socket_;
     std::unique_ptr<ListenerCore> core_;
     std::unique_ptr<Acceptance> acceptance_;
 };

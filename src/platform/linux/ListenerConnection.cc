@@ -40,7 +40,7 @@ public:
     bool sent = true;
 };
 
-void ListenerConnection::open(FileDescriptor socket, std::unique_ptr<Peer> peer, ListenerCharges::Account& account) {
+void ListenerConnection::open(PeerSocket socket, std::unique_ptr<Peer> peer, ListenerCharges::Account& account) {
     bool added = false;
     {
         // Under the mutex to the end: an event that belongs to an earlier life may come at any moment.
@@ -244,13 +244,16 @@ void ListenerConnection::close() {
 }
 
 void ListenerConnection::release() {
+    PeerSocket socket;
     ListenerCharges::Account* account = nullptr;
     {
         const MutexLock lock(mutex_);
-        socket_.reset();
+        socket = std::move(socket_);
         descriptor_ = -1;
         account = std::exchange(account_, nullptr);
     }
+    // A moment at most, but nobody should have to wait for the mutex meanwhile.
+    socket.reset();
     core_.charges.closeConnection(*account);
     core_.recycle(*this);
 }

@@ -7,7 +7,6 @@
 // connection arms it again under the mutex, so that the unsent rest is looked after.
 #pragma once
 
-#include "platform/FileDescriptor.h"
 #include "platform/Mutex.h"
 #include "platform/PeerIdentity.h"
 #include "platform/ServiceListener.h"
@@ -15,6 +14,7 @@
 #include "platform/linux/ListenerInput.h"
 #include "platform/linux/ListenerOutput.h"
 #include "platform/linux/ListenerPool.h"
+#include "platform/linux/PassedAlong.h"
 
 #include <atomic>
 #include <cstdint>
@@ -37,8 +37,7 @@ public:
     explicit ListenerConnection(ListenerCore& core) : core_(core) {}
 
     /// Begins to serve. The account holds the charge of this connection and is given back at its end.
-    void open(FileDescriptor socket, std::unique_ptr<Peer> peer, ListenerCharges::Account& account)
-        ZOR_EXCLUDES(mutex_);
+    void open(PeerSocket socket, std::unique_ptr<Peer> peer, ListenerCharges::Account& account) ZOR_EXCLUDES(mutex_);
     /// Ends the connection when no worker is left. Nothing happens when it has ended already.
     void endAfterStop() ZOR_EXCLUDES(mutex_);
 
@@ -98,7 +97,7 @@ private:
 
     Mutex mutex_;
     /// Closed only by the holder, who therefore may use descriptor_, the same number, without the mutex.
-    FileDescriptor socket_ ZOR_GUARDED_BY(mutex_);
+    PeerSocket socket_ ZOR_GUARDED_BY(mutex_);
     ListenerCharges::Account* account_ ZOR_GUARDED_BY(mutex_) = nullptr;
     bool open_ ZOR_GUARDED_BY(mutex_) = false;
     bool held_ ZOR_GUARDED_BY(mutex_) = false;

@@ -15,7 +15,7 @@ namespace zor::platform {
 namespace {
 
 /// Room for the sender's credentials and nothing else: descriptors that a peer sends along do not fit, and the kernel
-/// drops them without making them ours.
+/// closes them without making them ours, in this thread (PassedAlong.h).
 struct ControlBuffer {
     alignas(cmsghdr) char bytes[CMSG_SPACE(sizeof(ucred))];
 };
@@ -138,9 +138,11 @@ ListenerInput::Received ListenerInput::receive(int socket, ListenerScratch& scra
     message.msg_control = control.bytes;
     message.msg_controllen = sizeof control.bytes;
     ssize_t received = -1;
+    scratch.receiving.begin();
     do {
         received = ::recvmsg(socket, &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
     } while (received < 0 && errno == EINTR);
+    scratch.receiving.end();
     if (received < 0)
         return errno == EAGAIN || errno == EWOULDBLOCK ? Received::nothing : Received::ended;
     if (received == 0)

@@ -84,24 +84,31 @@ bool ListenerPool::start() {
 }
 
 void ListenerPool::stop() {
-    std::vector<std::unique_ptr<Worker>> workers;
+    std::vector<std::thread*> threads;
     {
         const MutexLock lock(mutex_);
         stopping_ = true;
-        workers.swap(workers_);
+        for (const auto& worker : workers_)
+            threads.push_back(&worker->thread);
         joinEnded();
     }
     parkedWake_.broadcast();
     watcherWake_.broadcast();
     if (wake_.valid())
         wakeWaiting();
+    for (std::thread* thread : threads)
+        thread->join();
+    {
+        const MutexLock lock(mutex_);
+        workersJoined_ = true;
+    }
+    watcherWake_.broadcast();
     if (watcher_.joinable())
         watcher_.join();
-    for (const auto& worker : workers)
-        worker->thread.join();
     const MutexLock lock(mutex_);
-    for (const auto& worker : workers)
+    for (const auto& worker : workers_)
         messagesOfEnded_ += worker->scratch.messages.load(std::memory_order_relaxed);
+    workers_.clear();
     requeued_.clear();
     requeuedCount_ = 0;
     laterJob_ = nullptr;
@@ -157,6 +164,7 @@ ListenerPool::Counters ListenerPool::counters() const {
 
 void ListenerPool::work(Worker& worker) {
     worker.threadId = ::gettid();
+    allowInterrupts();
     BlockingObserver::setForThisThread(&worker);
     while (!stopping_) {
         if (active_ > running_ && !parkWhileEnoughRun(worker))
@@ -325,7 +333,8 @@ void ListenerPool::nobodyWaits() {
     }
 }
 
-// The watcher: finds handlers that wait without having said so, and makes up for threads that could not be started.
+// The watcher: finds handlers that wait without having said so, makes up for threads that could not be started, and
+// interrupts receives that do not end.
 
 void ListenerPool::watch() {
     const MutexLock lock(mutex_);
@@ -356,15 +365,31 @@ void ListenerPool::watch() {
         nextTick = now + tick_;
         tick();
     }
+    while (!workersJoined_) {
+        interruptReceivers();
+        watcherWake_.waitFor(mutex_, tick_);
+    }
 }
 
 void ListenerPool::tick() {
-    if (waiting_ > 0 || !canGrow()) {
+    if (waiting_ > 0) {
         watching_ = false;
         // Between the look and the flag the last one may have stopped waiting, and left the flag to this thread.
-        if (waiting_ > 0 || !canGrow() || watching_.exchange(true))
+        if (waiting_ > 0 || watching_.exchange(true))
             return;
     }
+    interruptReceivers();
+    if (canGrow())
+        makeUpForStuckWorkers();
+}
+
+void ListenerPool::interruptReceivers() {
+    for (const auto& worker : workers_)
+        if (worker->scratch.receiving.hasStayed())
+            interruptThread(worker->threadId);
+}
+
+void ListenerPool::makeUpForStuckWorkers() {
     for (const auto& worker : workers_) {
         if (!isStuck(*worker) || !workIsReady())
             continue;

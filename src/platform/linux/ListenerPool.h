@@ -16,14 +16,15 @@
 //   - an armed descriptor wakes one worker. A task may still be called for an event that is out of date, or while
 //   another
 //     worker has it (after a rearm from outside): it has to tell that itself.
-// The watcher is a thread that sleeps without a timeout while anybody waits; an idle pool costs nothing. Handlers that
-// only compute never make the pool grow: the watcher looks at the state of their threads.
+// The watcher is a thread that sleeps without a timeout while anybody waits, and ticks while nobody does; an idle pool
+// costs nothing. Handlers that only compute never make the pool grow: the watcher looks at the state of their threads.
 #pragma once
 
 #include "platform/BlockingScope.h"
 #include "platform/FileDescriptor.h"
 #include "platform/Mutex.h"
 #include "platform/linux/ListenerLimits.h"
+#include "platform/linux/PassedAlong.h"
 
 #include <atomic>
 #include <chrono>
@@ -42,6 +43,8 @@ struct ListenerScratch {
     std::unique_ptr<std::uint8_t[]> bytes = std::make_unique_for_overwrite<std::uint8_t[]>(listenerScratchBytes);
     /// Requests that this worker has served. Written by it alone.
     std::atomic<std::uint64_t> messages{0};
+    /// Set around each receive, so that nothing a peer passed along holds the worker there.
+    ReceivingMark receiving;
 };
 
 class ListenerTask {
@@ -127,6 +130,9 @@ private:
     void nobodyWaits();
     void watch();
     void tick() ZOR_REQUIRES(mutex_);
+    void makeUpForStuckWorkers() ZOR_REQUIRES(mutex_);
+    /// Has workers go on that are held in a receive since the last look.
+    void interruptReceivers() ZOR_REQUIRES(mutex_);
     bool workIsReady() const;
     /// Whether the worker has been in one task since the last tick, has computed next to nothing there, and is not
     /// about to.
@@ -144,15 +150,18 @@ private:
     std::atomic<unsigned> waiting_{0};
     std::atomic<unsigned> active_{0};
     std::atomic<unsigned> requeuedCount_{0};
+    /// Whether the watcher ticks. Only its own look at `waiting_` ends that.
     std::atomic<bool> watching_{false};
 
     mutable Mutex mutex_;
+    /// No worker comes or goes once the pool is stopping.
     std::vector<std::unique_ptr<Worker>> workers_ ZOR_GUARDED_BY(mutex_);
     std::vector<std::unique_ptr<Worker>> ended_ ZOR_GUARDED_BY(mutex_);
     std::deque<ListenerTask*> requeued_ ZOR_GUARDED_BY(mutex_);
     unsigned parked_ ZOR_GUARDED_BY(mutex_) = 0;
     /// Parked workers that were called back and have not woken yet.
     unsigned called_ ZOR_GUARDED_BY(mutex_) = 0;
+    bool workersJoined_ ZOR_GUARDED_BY(mutex_) = false;
     unsigned threadsMost_ ZOR_GUARDED_BY(mutex_) = 0;
     std::uint64_t messagesOfEnded_ ZOR_GUARDED_BY(mutex_) = 0;
     std::function<void()> laterJob_ ZOR_GUARDED_BY(mutex_);

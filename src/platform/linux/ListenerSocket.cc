@@ -37,6 +37,7 @@ std::expected<FileDescriptor, int> makeListenerSocket(const ListenerAddress& add
     FileDescriptor socket(::socket(AF_UNIX, type | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
     if (!socket.valid())
         return std::unexpected(errno);
+    refuseDescriptors(socket.get());
     if (::unlinkat(address.directory, address.name.c_str(), 0) != 0 && errno != ENOENT)
         return std::unexpected(errno);
     if (::bind(socket.get(), reinterpret_cast<const sockaddr*>(&socketAddress), sizeof socketAddress) != 0)
@@ -64,6 +65,7 @@ int adoptListenerSocket(int socket, int type) {
     const int flags = ::fcntl(socket, F_GETFL);
     if (flags < 0 || ::fcntl(socket, F_SETFL, flags | O_NONBLOCK) != 0 || ::fcntl(socket, F_SETFD, FD_CLOEXEC) != 0)
         return errno;
+    refuseDescriptors(socket);
     return 0;
 }
 
@@ -76,7 +78,7 @@ ListenerAcceptor::ListenerAcceptor() : reserve_(::eventfd(0, EFD_CLOEXEC)) {}
 
 ListenerAcceptor::Accepted ListenerAcceptor::accept(int listening) {
     for (;;) {
-        FileDescriptor socket(::accept4(listening, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
+        PeerSocket socket(FileDescriptor(::accept4(listening, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC)));
         if (socket.valid()) {
             if (!reserve_.valid()) {
                 // The first descriptor to be had again goes to the reserve.
@@ -103,7 +105,7 @@ ListenerAcceptor::Accepted ListenerAcceptor::accept(int listening) {
         if (!reserve_.valid())
             return {.outcome = Outcome::exhausted, .socket = {}};
         reserve_.reset();
-        socket.reset(::accept4(listening, nullptr, nullptr, SOCK_CLOEXEC));
+        socket = PeerSocket(FileDescriptor(::accept4(listening, nullptr, nullptr, SOCK_CLOEXEC)));
         // The kernel looks for a descriptor before it looks whether anybody waits.
         const bool nobody = !socket.valid() && (errno == EAGAIN || errno == EWOULDBLOCK);
         const bool taken = socket.valid();

@@ -3,6 +3,7 @@
 #pragma once
 
 #include "platform/FileDescriptor.h"
+#include "platform/linux/PassedAlong.h"
 
 #include <expected>
 #include <string>
@@ -27,7 +28,8 @@ struct ListenerAddress {
 /// Makes a listening socket that was passed in ready for use: non-blocking, closed on exec. EINVAL when it is none.
 [[nodiscard]] int adoptListenerSocket(int socket, int type);
 
-/// Has the kernel say who sent each piece of what arrives. Accepted sockets take it over from the listening one.
+/// Has the kernel say who sent each piece of what arrives. Whoever connects to a listening socket from then on takes it
+/// over.
 [[nodiscard]] int enableSenderCredentials(int socket);
 
 /// Accepts connections of one listening socket. When the process is out of descriptors, one kept in reserve is spent to
@@ -49,7 +51,7 @@ public:
     struct Accepted {
         Outcome outcome = Outcome::none;
         /// Non-blocking, closed on exec; valid when accepted.
-        FileDescriptor socket;
+        PeerSocket socket;
     };
     [[nodiscard]] Accepted accept(int listening);
 

@@ -52,7 +52,7 @@ int SeqpacketUpcallPort::checkIn() {
         checkInCallName_ = "LISTEN_FDS";
         if (const int error = adoptListenerSocket(passed_.get(), SOCK_SEQPACKET); error != 0)
             return error;
-        listening_ = std::move(passed_);
+        listening_ = PeerSocket(std::move(passed_));
     } else {
         checkInCallName_ = "bind";
         const ListenerAddress address{.directory = root_.runtimeDirectory(),
@@ -61,7 +61,7 @@ int SeqpacketUpcallPort::checkIn() {
         auto made = makeListenerSocket(address, SOCK_SEQPACKET, socketMode);
         if (!made)
             return made.error();
-        listening_ = std::move(*made);
+        listening_ = PeerSocket(std::move(*made));
     }
     checkInCallName_ = "setsockopt";
     if (const int error = enableSenderCredentials(listening_.get()); error != 0)
@@ -128,7 +128,7 @@ void SeqpacketUpcallPort::serveConnection(int fd) {
 }
 
 SeqpacketUpcallPort::Received SeqpacketUpcallPort::receive(const Connection& connection, UpcallPacket& packet) {
-    // Room for the credentials alone: descriptors that somebody sends along find none and are closed by the kernel.
+    // Room for the credentials alone: descriptors that somebody sends along find none, and the kernel closes them here.
     alignas(cmsghdr) char control[CMSG_SPACE(sizeof(ucred))] = {};
     iovec part{.iov_base = buffer_.data(), .iov_len = buffer_.size()};
     msghdr message{};
@@ -137,9 +137,12 @@ SeqpacketUpcallPort::Received SeqpacketUpcallPort::receive(const Connection& con
     message.msg_control = control;
     message.msg_controllen = sizeof control;
     ssize_t bytes = 0;
-    do {
-        bytes = ::recvmsg(connection.socket.get(), &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
-    } while (bytes < 0 && errno == EINTR);
+    {
+        const InterruptedScope whatPeersPassed;
+        do {
+            bytes = ::recvmsg(connection.socket.get(), &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+        } while (bytes < 0 && errno == EINTR);
+    }
     if (bytes < 0)
         return errno == EAGAIN || errno == EWOULDBLOCK ? Received::nothing : Received::ended;
     bool hasControl = false;

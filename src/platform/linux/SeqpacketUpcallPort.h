@@ -40,7 +40,7 @@ public:
 
 private:
     struct Connection {
-        FileDescriptor socket;
+        PeerSocket socket;
         std::unique_ptr<Peer> peer;
     };
     enum class Received { packet, nothing, dropped, ended };
@@ -56,7 +56,7 @@ private:
     PeerIdentity& identity_;
     const char* checkInCallName_ = "bind";
     FileDescriptor passed_;
-    FileDescriptor listening_;
+    PeerSocket listening_;
     ListenerAcceptor acceptor_;
     std::size_t replyBytesMax_ = 0;
     RunLoop* loop_ = nullptr;

@@ -35,7 +35,7 @@ int StatusSocket::open(const ListenerAddress& address) {
     auto made = makeListenerSocket(address, SOCK_STREAM, 0666);
     if (!made)
         return made.error();
-    listening_ = std::move(*made);
+    listening_ = PeerSocket(std::move(*made));
     made_ = address;
     return serve();
 }
@@ -43,7 +43,7 @@ int StatusSocket::open(const ListenerAddress& address) {
 int StatusSocket::adopt(FileDescriptor listening) {
     if (const int error = adoptListenerSocket(listening.get(), SOCK_STREAM); error != 0)
         return error;
-    listening_ = std::move(listening);
+    listening_ = PeerSocket(std::move(listening));
     return serve();
 }
 

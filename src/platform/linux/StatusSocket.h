@@ -46,7 +46,7 @@ private:
     PeerIdentity& identity_;
     RunLoop& runLoop_;
     const Build build_;
-    FileDescriptor listening_;
+    PeerSocket listening_;
     ListenerAddress made_;
     ListenerAcceptor acceptor_;
     plist::Data frame_;

@@ -1,0 +1,200 @@
+// SPDX-License-Identifier: Apache-2.0
+// What peers pass along with their bytes holds no thread: neither one that receives it, nor one that closes the socket
+// in which it lies unread. Method: TCP sockets that linger for twenty seconds, because nobody reads at their far end.
+// They are sent before the listening socket comes to the listener; after that newer kernels refuse them.
+#include "platform/ListenerWorld.h"
+#include "platform/linux/EpollRunLoop.h"
+#include "platform/linux/StatusSocket.h"
+#include "support/FileTree.h"
+#include "support/ProcessResources.h"
+
+#include <gtest/gtest.h>
+
+#include <arpa/inet.h>
+#include <cerrno>
+#include <cstring>
+#include <netinet/in.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <thread>
+#include <unistd.h>
+
+namespace zor::platform::test {
+namespace {
+
+using std::chrono::milliseconds;
+using std::chrono::seconds;
+
+/// Whether a test ended before what lingers did.
+class Patience {
+public:
+    ~Patience() { EXPECT_LT(std::chrono::steady_clock::now() - begin_, seconds(10)); }
+
+private:
+    const std::chrono::steady_clock::time_point begin_ = std::chrono::steady_clock::now();
+};
+
+struct LingeringSocket {
+    LingeringSocket() {
+        const FileDescriptor listening(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+        sockaddr_in address = {};
+        address.sin_family = AF_INET;
+        address.sin_addr.s_addr = ::htonl(INADDR_LOOPBACK);
+        socklen_t length = sizeof address;
+        auto* const plain = reinterpret_cast<sockaddr*>(&address);
+        EXPECT_EQ(::bind(listening.get(), plain, length) | ::listen(listening.get(), 1), 0);
+        EXPECT_EQ(::getsockname(listening.get(), plain, &length) | ::connect(near.get(), plain, length), 0);
+        far.reset(::accept4(listening.get(), nullptr, nullptr, SOCK_CLOEXEC));
+        const linger lingering = {.l_onoff = 1, .l_linger = 20};
+        EXPECT_EQ(::setsockopt(near.get(), SOL_SOCKET, SO_LINGER, &lingering, sizeof lingering), 0);
+        const std::vector<char> bytes(1 << 16);
+        while (::send(near.get(), bytes.data(), bytes.size(), MSG_DONTWAIT) > 0) {
+        }
+    }
+    FileDescriptor near{::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)};
+    FileDescriptor far;
+};
+
+bool sendAlong(int socket, const plist::Data& bytes, const FileDescriptor& descriptor) {
+    iovec part = {.iov_base = const_cast<std::uint8_t*>(bytes.data()), .iov_len = bytes.size()};
+    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
+    msghdr message = {};
+    message.msg_iov = &part;
+    message.msg_iovlen = 1;
+    message.msg_control = control;
+    message.msg_controllen = sizeof control;
+    cmsghdr* header = CMSG_FIRSTHDR(&message);
+    header->cmsg_level = SOL_SOCKET;
+    header->cmsg_type = SCM_RIGHTS;
+    header->cmsg_len = CMSG_LEN(sizeof(int));
+    const int passed = descriptor.get();
+    std::memcpy(CMSG_DATA(header), &passed, sizeof passed);
+    return ::sendmsg(socket, &message, MSG_NOSIGNAL) == static_cast<ssize_t>(bytes.size());
+}
+
+/// A listening socket as the service manager passes it, with clients that have sent a request and a lingering socket.
+class EarlyClients {
+public:
+    explicit EarlyClients(std::size_t count) {
+        sockaddr_un address = {};
+        address.sun_family = AF_UNIX;
+        path().copy(address.sun_path, sizeof address.sun_path - 1);
+        EXPECT_EQ(::bind(listening.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+        EXPECT_EQ(::listen(listening.get(), 16), 0);
+        while (clients.size() < count) {
+            clients.emplace_back(path());
+            LingeringSocket lingering;
+            EXPECT_TRUE(sendAlong(clients.back().socket(), frameOf(numbered(1), 1), lingering.near));
+            farEnds_.push_back(std::move(lingering.far));
+        }
+    }
+    std::string path() const { return directory_.path() + "/s"; }
+
+    FileDescriptor listening{::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)};
+    std::vector<RawClient> clients;
+
+private:
+    const support::TemporaryDirectory directory_{"/tmp"};
+    std::vector<FileDescriptor> farEnds_;
+};
+
+class ListenerOf {
+public:
+    ListenerOf(EarlyClients& early, const ListenerLimits& limits) : listener_(identity_, optionsOf(early, limits)) {
+        identity_.everybodyOwnsRoot = false;
+        EXPECT_TRUE(listener_.resume([](PeerConnection&, ServiceEvent& event) {
+            if (event.reply)
+                event.reply->send(event.request);
+        }));
+    }
+
+private:
+    static ListenerOptions optionsOf(EarlyClients& early, const ListenerLimits& limits) {
+        ListenerOptions options;
+        options.passed = std::move(early.listening);
+        options.limits = limits;
+        return options;
+    }
+    KernelIdentity identity_;
+    LinuxServiceListener listener_;
+};
+
+// Every thread receives one, and there can be no more threads; afterwards nothing of it is open in this process.
+TEST(PassedAlong, DoesNotHoldWhoReceivesIt) {
+    EarlyClients early(4);
+    const support::ProcessResources before;
+    {
+        const Patience patience;
+        const ListenerOf listener(early, {.threadsRunning = 2, .threadsMax = 2});
+        for (RawClient& client : early.clients)
+            EXPECT_TRUE(client.receive());
+    }
+    EXPECT_EQ(before.leakedSince(), "");
+}
+
+// The watcher's ticks are so rare here that all threads are held when the listener stops.
+TEST(PassedAlong, DoesNotHoldTheStop) {
+    EarlyClients early(2);
+    const Patience patience;
+    const ListenerOf listener(early, {.threadsRunning = 2, .threadsMax = 2, .tick = milliseconds(1000)});
+    std::this_thread::sleep_for(milliseconds(100));
+}
+
+// Connections over the user's share are closed with the bytes unread; the acceptor goes on.
+TEST(PassedAlong, DoesNotHoldWhoRefusesIt) {
+    EarlyClients early(4);
+    const Patience patience;
+    const ListenerOf listener(early, {.connectionsMaxPerUser = 1});
+    EXPECT_TRUE(early.clients[0].receive());
+    for (std::size_t i = 1; i < early.clients.size(); ++i)
+        EXPECT_TRUE(early.clients[i].ended());
+    early.clients[0].close();
+    EXPECT_TRUE(eventually([&] { return RawClient(early.path()).isServed(); }));
+}
+
+// The status reads nothing: its thread, the main one, closes each connection with the bytes in it.
+TEST(PassedAlong, DoesNotHoldTheStatus) {
+    EarlyClients early(3);
+    const Patience patience;
+    KernelIdentity identity;
+    EpollRunLoop loop;
+    StatusSocket status(identity, loop, [](Peer&, StatusSocket::Detail) { return plist::Dictionary{}; });
+    ASSERT_EQ(status.adopt(std::move(early.listening)), 0);
+    std::thread thread([&] { loop.run(); });
+    for (RawClient& client : early.clients)
+        EXPECT_TRUE(client.receive());
+    loop.stop();
+    thread.join();
+}
+
+// Who connected before the listener had the socket is asked for its credentials all the same.
+TEST(PassedAlong, OfAnotherProcessEndsAnEarlyConnectionToo) {
+    EarlyClients early(1);
+    const ListenerOf listener(early, {.threadsRunning = 1, .threadsMax = 1});
+    EXPECT_TRUE(early.clients[0].receive());
+    const plist::Data frame = frameOf(numbered(2), 2);
+    const pid_t child = ::fork();
+    if (child == 0)
+        ::_exit(::send(early.clients[0].socket(), frame.data(), frame.size(), MSG_NOSIGNAL) > 0 ? 0 : 1);
+    EXPECT_TRUE(early.clients[0].ended());
+    ::waitpid(child, nullptr, 0);
+}
+
+// Once the socket is the listener's the kernel refuses at the sender, if it can.
+TEST(PassedAlong, IsRefusedAtTheSender) {
+    constexpr int passRights = 83;
+    EarlyClients early(0);
+    const ListenerOf listener(early, {});
+    int known = 0;
+    socklen_t length = sizeof known;
+    RawClient client(early.path());
+    if (::getsockopt(client.socket(), SOL_SOCKET, passRights, &known, &length) != 0)
+        GTEST_SKIP() << "the kernel cannot";
+    EXPECT_FALSE(sendAlong(client.socket(), frameOf(numbered(1), 1), FileDescriptor(::dup(0))));
+    EXPECT_EQ(errno, EPERM);
+    EXPECT_TRUE(client.isServed());
+}
+
+} // namespace
+} // namespace zor::platform::test
