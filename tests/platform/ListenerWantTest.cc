@@ -12,7 +12,7 @@
 #include <sys/socket.h>
 #include <thread>
 
-namespace zor::platform::test {
+namespace zor::platform {
 namespace {
 
 // Goal: threads that become free are used although the others never say that they wait. Method: all threads are taken,
@@ -71,4 +71,4 @@ TEST(ListenerWant, ASocketThatCannotBeServedIsClosed) {
 }
 
 } // namespace
-} // namespace zor::platform::test
+} // namespace zor::platform

@@ -12,15 +12,12 @@
 
 #include <arpa/inet.h>
 #include <cerrno>
-#include <cstring>
 #include <netinet/in.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <thread>
 #include <unistd.h>
 
-namespace zor::platform::test {
+namespace zor::platform {
 namespace {
 
 using std::chrono::milliseconds;
@@ -56,36 +53,17 @@ struct LingeringSocket {
     FileDescriptor far;
 };
 
-bool sendAlong(int socket, const plist::Data& bytes, const FileDescriptor& descriptor) {
-    iovec part = {.iov_base = const_cast<std::uint8_t*>(bytes.data()), .iov_len = bytes.size()};
-    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-    msghdr message = {};
-    message.msg_iov = &part;
-    message.msg_iovlen = 1;
-    message.msg_control = control;
-    message.msg_controllen = sizeof control;
-    cmsghdr* header = CMSG_FIRSTHDR(&message);
-    header->cmsg_level = SOL_SOCKET;
-    header->cmsg_type = SCM_RIGHTS;
-    header->cmsg_len = CMSG_LEN(sizeof(int));
-    const int passed = descriptor.get();
-    std::memcpy(CMSG_DATA(header), &passed, sizeof passed);
-    return ::sendmsg(socket, &message, MSG_NOSIGNAL) == static_cast<ssize_t>(bytes.size());
-}
-
 /// A listening socket as the service manager passes it, with clients that have sent a request and a lingering socket.
 class EarlyClients {
 public:
     explicit EarlyClients(std::size_t count) {
-        sockaddr_un address = {};
-        address.sun_family = AF_UNIX;
-        path().copy(address.sun_path, sizeof address.sun_path - 1);
+        const sockaddr_un address = addressOf(path());
         EXPECT_EQ(::bind(listening.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
         EXPECT_EQ(::listen(listening.get(), 16), 0);
         while (clients.size() < count) {
             clients.emplace_back(path());
             LingeringSocket lingering;
-            EXPECT_TRUE(sendAlong(clients.back().socket(), frameOf(numbered(1), 1), lingering.near));
+            EXPECT_TRUE(sendWithDescriptor(clients.back().socket(), frameOf(numbered(1), 1), lingering.near.get()));
             farEnds_.push_back(std::move(lingering.far));
         }
     }
@@ -191,10 +169,10 @@ TEST(PassedAlong, IsRefusedAtTheSender) {
     RawClient client(early.path());
     if (::getsockopt(client.socket(), SOL_SOCKET, passRights, &known, &length) != 0)
         GTEST_SKIP() << "the kernel cannot";
-    EXPECT_FALSE(sendAlong(client.socket(), frameOf(numbered(1), 1), FileDescriptor(::dup(0))));
+    EXPECT_FALSE(sendWithDescriptor(client.socket(), frameOf(numbered(1), 1), 0));
     EXPECT_EQ(errno, EPERM);
     EXPECT_TRUE(client.isServed());
 }
 
 } // namespace
-} // namespace zor::platform::test
+} // namespace zor::platform
