@@ -104,7 +104,7 @@ private:
     }
     static std::unique_ptr<platform::LinuxPlatform> openPlatform(const std::string& root) {
         auto opened = platform::LinuxPlatform::open({.rootDirectory = root, .syncs = platform::Syncs::off});
-        require(opened.has_value());
+        require(opened.has_value() && (*opened)->roles().deathRowQueue.start());
         return std::move(*opened);
     }
 

@@ -22,6 +22,10 @@ int Daemon::run() {
     const platform::Platform& platform = composition_.platform();
     auto startUp = platform.transactions.hold();
     openLog();
+    if (!startQueues()) {
+        composition_.log().write(logLevelError, "main", "Can't create dispatch queues. Exiting.");
+        return -1;
+    }
     setUp();
     followLockState();
     evaluateLockState();
@@ -48,6 +52,11 @@ void Daemon::openLog() {
     platform.log.enableDiskLogging(file.path(), size.fileCount, size.fileBytesMax);
     if (composition_.log().writes(logLevelDebug))
         composition_.log().write(logLevelDebug, "main", "zorvaned built at %s %s started", __DATE__, __TIME__);
+}
+
+bool Daemon::startQueues() {
+    const platform::Platform& platform = composition_.platform();
+    return platform.deathRowQueue.start() && platform.lockStateQueue.start();
 }
 
 void Daemon::setUp() {

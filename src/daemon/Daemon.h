@@ -33,6 +33,7 @@ public:
     void evaluateLockState();
 
 private:
+    bool startQueues();
     bool startUpcallServer();
     /// Without it the daemon serves the upcall alone, and nobody is told that it is ready.
     bool startListener();

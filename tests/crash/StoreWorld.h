@@ -35,6 +35,7 @@ private:
 
 class ImmediateQueue final : public platform::WorkQueue {
 public:
+    bool start() override { return true; }
     void async(std::function<void()> job) override { job(); }
     void suspend() override {}
     void resume() override {}

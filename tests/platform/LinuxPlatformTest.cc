@@ -32,6 +32,7 @@ TEST(LinuxPlatform, OwnsOneRootAtATime) {
             roles.upcallPort.serve(roles.runLoop, [](const UpcallPacket&) { return std::vector<std::uint8_t>(); }));
         EXPECT_EQ(roles.lockState.registerForChanges(roles.runLoop, [] {}), 0);
         std::atomic<int> ran{0};
+        EXPECT_TRUE(roles.deathRowQueue.start() && roles.lockStateQueue.start());
         roles.deathRowQueue.async([&] { ++ran; });
         roles.lockStateQueue.suspend();
         roles.lockStateQueue.async([&, mark = roles.transactions.hold()] { ++ran; });

@@ -22,6 +22,7 @@ TEST(SerialWorkQueue, RunsOneAtATimeInOrder) {
     std::vector<std::vector<int>> seen(4);
     {
         SerialWorkQueue queue("com.veltra.test");
+        ASSERT_TRUE(queue.start());
         inThreads(4, [&](unsigned thread) {
             for (int i = 0; i < 500; ++i)
                 queue.async([&, thread, i] {
@@ -42,6 +43,7 @@ TEST(SerialWorkQueue, RunsOneAtATimeInOrder) {
 TEST(SerialWorkQueue, BeginsNothingWhileSuspended) {
     std::atomic<int> ran{0};
     SerialWorkQueue queue("com.veltra.test");
+    ASSERT_TRUE(queue.start());
     for (int round = 1; round <= 100; ++round) {
         for (int i = 0; i < 5; ++i)
             queue.async([&] { ++ran; });
@@ -64,6 +66,7 @@ TEST(SerialWorkQueue, FinishesOrDropsWhatIsQueued) {
     std::atomic<int> ran{0};
     {
         SerialWorkQueue queue("com.veltra.test");
+        ASSERT_TRUE(queue.start());
         for (int i = 0; i < 10; ++i)
             queue.async([&, held] { queue.async([&, held] { ++ran; }); });
         queue.finish();
@@ -73,6 +76,7 @@ TEST(SerialWorkQueue, FinishesOrDropsWhatIsQueued) {
     EXPECT_EQ(ran.load(), 10);
     {
         SerialWorkQueue queue("com.veltra.test");
+        ASSERT_TRUE(queue.start());
         queue.suspend();
         for (int i = 0; i < 10; ++i)
             queue.async([&, held] { ++ran; });
@@ -88,6 +92,7 @@ TEST(SerialWorkQueue, BackgroundIsIdle) {
     char name[16] = {};
     {
         SerialWorkQueue queue("com.veltra.zorvaned.deathrow", WorkQueue::Priority::background);
+        ASSERT_TRUE(queue.start());
         queue.async([&] {
             policy = ::sched_getscheduler(0);
             ioPriority = ::syscall(SYS_ioprio_get, 1, 0);

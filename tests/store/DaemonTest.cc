@@ -128,16 +128,18 @@ TEST(DaemonLife, FollowsTheLockState) {
 }
 
 // Goal: a launch serves when it says that it is ready, is busy until then, and ends when told; without the listener it
-// goes on and never says so, without the upcall port it does not. Method: whole runs, with something in the place of a
-// socket.
+// goes on and never says so, without the upcall port or a queue it does not, and without a queue it touches nothing.
+// Method: whole runs, with something in the place of a socket, and with a queue that gets no thread.
 TEST(DaemonLife, RunsUntilToldToStop) {
-    enum class Blocked { nothing, listener, upcall };
-    for (const Blocked blocked : {Blocked::nothing, Blocked::listener, Blocked::upcall}) {
+    enum class Blocked { nothing, listener, upcall, queue };
+    for (const Blocked blocked : {Blocked::nothing, Blocked::listener, Blocked::upcall, Blocked::queue}) {
         World world;
         if (blocked == Blocked::listener)
             world.makeDirectories("run/zorvane/com.veltra.zorvaned/occupied");
         if (blocked == Blocked::upcall)
             world.makeDirectories("run/zorvane/com.veltra.zorvaned.upcall/occupied");
+        world.lockStateQueue.canStart = blocked != Blocked::queue;
+        const bool serves = blocked == Blocked::nothing || blocked == Blocked::listener;
         world.lockState.state = 1;
         bool ready = false;
         platform::Platform roles = world.linux().roles();
@@ -150,9 +152,10 @@ TEST(DaemonLife, RunsUntilToldToStop) {
                       }});
         if (blocked == Blocked::listener)
             roles.runLoop.stop();
-        EXPECT_EQ(daemon.run(), blocked == Blocked::upcall ? -1 : 0);
+        EXPECT_EQ(daemon.run(), serves ? 0 : -1);
         EXPECT_EQ(ready, blocked == Blocked::nothing);
         const auto said = world.log.take();
+        EXPECT_EQ(hasLine(said, 3, "main", "Can't create dispatch queues. Exiting."), blocked == Blocked::queue);
         EXPECT_EQ(hasLine(said, 3, "main", "unable to start ipsi service!"), blocked == Blocked::listener);
         EXPECT_EQ(hasLine(said, 3, "main", "Failed to initialize kernel upcall interface. THIS IS BAD! Exiting."),
                   blocked == Blocked::upcall);
@@ -162,7 +165,7 @@ TEST(DaemonLife, RunsUntilToldToStop) {
             EXPECT_EQ(cause.function, "ZORKernServerStart");
             EXPECT_TRUE(cause.message.starts_with(std::string(roles.upcallPort.checkInCallName()) + ": ")) << cause;
         }
-        EXPECT_TRUE(world.bootMarker.state.present);
+        EXPECT_EQ(world.bootMarker.state.present, blocked != Blocked::queue);
     }
 }
 

@@ -94,6 +94,7 @@ void World::start() {
     require(opened.has_value(), "no platform");
     platform_ = std::move(*opened);
     lockStateQueue.inner = &platform_->roles().lockStateQueue;
+    require(lockStateQueue.start() && platform_->roles().deathRowQueue.start(), "no thread");
     sandbox.inner = &platform_->roles().sandbox;
     protection_ = std::make_unique<platform::XattrProtectionClass>(faults_, lockState);
     composition_ = std::make_unique<Composition>(withRoles(platform_->roles(), *this), options_.probe);

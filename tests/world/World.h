@@ -69,6 +69,7 @@ public:
 /// Counts what the queue behind it is told.
 class CountingQueue final : public platform::WorkQueue {
 public:
+    bool start() override { return canStart && inner->start(); }
     void async(std::function<void()> job) override { inner->async(std::move(job)); }
     void suspend() override {
         ++suspended;
@@ -79,6 +80,7 @@ public:
         inner->resume();
     }
     platform::WorkQueue* inner = nullptr;
+    bool canStart = true;
     std::atomic<int> suspended{0};
     std::atomic<int> resumed{0};
 };

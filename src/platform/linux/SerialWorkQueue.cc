@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/linux/SerialWorkQueue.h"
 
+#include <exception>
 #include <pthread.h>
 #include <sched.h>
 #include <sys/syscall.h>
@@ -44,7 +45,7 @@ void SerialWorkQueue::finish() {
     {
         const MutexLock lock(mutex_);
         ending_ = true;
-        if (suspended_)
+        if (suspended_ || !thread_.joinable())
             dropped.swap(jobs_);
         suspended_ = false;
         thread = std::move(thread_);
@@ -57,20 +58,24 @@ void SerialWorkQueue::finish() {
     finished_ = true;
 }
 
+bool SerialWorkQueue::start() {
+    const MutexLock lock(mutex_);
+    if (thread_.joinable())
+        return true;
+    try {
+        thread_ = std::thread(&SerialWorkQueue::work, this);
+    } catch (const std::exception&) {
+        return false; // no thread, or no memory for one
+    }
+    return true;
+}
+
 void SerialWorkQueue::async(std::function<void()> job) {
     {
         const MutexLock lock(mutex_);
         if (finished_)
             return;
         jobs_.push_back(std::move(job));
-        if (!thread_.joinable() && !ending_) {
-            try {
-                thread_ = std::thread(&SerialWorkQueue::work, this);
-            } catch (...) {
-                jobs_.pop_back();
-                throw;
-            }
-        }
     }
     changed_.signal();
 }

@@ -3,7 +3,8 @@
 // else to do, so its jobs hold no lock that others wait for.
 //
 // Destroying a queue waits for the running job and for all that are queued, including those that they queue; of a
-// suspended queue the queued jobs are dropped (destroyed without having run). No other thread may use it then.
+// queue that is suspended, or was never started, the queued jobs are dropped (destroyed without having run). No other
+// thread may use it then.
 #pragma once
 
 #include "platform/Mutex.h"
@@ -22,7 +23,8 @@ public:
     SerialWorkQueue(const SerialWorkQueue&) = delete;
     SerialWorkQueue& operator=(const SerialWorkQueue&) = delete;
 
-    /// Throws std::system_error, and queues nothing, when the system gives no thread for the first job.
+    /// Once more does nothing.
+    [[nodiscard]] bool start() override;
     void async(std::function<void()> job) override;
     // After a finish has begun neither has any effect.
     void suspend() override;
