@@ -117,7 +117,7 @@ void WorkCheck::checkMappings() {
                                 .appendingDirectory(platform::names::sandboxDirectory);
     platform::forEachSandboxDirectory(root, [&](const platform::SandboxDirectory& directory) {
         const FileURL url = sandbox.appendingDirectory(directory.user).appendingDirectory(directory.itemType);
-        for (const std::string& name : platform::directoryNames(directory.descriptor)) {
+        for (const std::string& name : platform::directoryNamesIfAny(directory.descriptor)) {
             if (platform::isSandboxLeftover(name)) {
                 look_.add(FindingCode::writeLeftover, url.appendingFile(name),
                           "is a sandbox mapping whose making was cut short", Mender::launch);

@@ -48,7 +48,8 @@ public:
 class PeerIdentity {
 public:
     virtual ~PeerIdentity() = default;
-    /// Pins the peer of a connected socket. nullptr when the kernel does not tell who it is. Any thread.
+    /// Pins the peer of a connected socket. nullptr when the kernel does not tell who it is, or there is no descriptor
+    /// or no memory to pin it with: errno says which. Any thread.
     [[nodiscard]] virtual std::unique_ptr<Peer> peerOfSocket(int socket) = 0;
     /// Whether this kernel uid counts as the owner of the root: root, or the daemon's own user.
     [[nodiscard]] virtual bool ownsRoot(uid_t uid) const = 0;

@@ -6,10 +6,6 @@
 
 namespace zor {
 
-bool isOwnShortage(int errorNumber) {
-    return errorNumber == EMFILE || errorNumber == ENFILE || errorNumber == ENOMEM;
-}
-
 std::string ZORError::text() const {
     return formatted("%s %d \"%s\"", domainName(), code_, ZOR_SHOWN(description_));
 }

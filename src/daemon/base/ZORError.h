@@ -4,6 +4,7 @@
 
 #include "daemon/base/ErrorCode.h"
 #include "daemon/base/Log.h"
+#include "platform/Shortage.h"
 
 #include <memory>
 #include <optional>
@@ -20,8 +21,7 @@ struct Here {
 };
 #define ZOR_HERE (::zor::Here{__func__, __LINE__})
 
-/// This process ran out of descriptors or memory: the error says nothing about the item.
-[[nodiscard]] bool isOwnShortage(int errorNumber);
+using platform::isOwnShortage;
 
 class ZORError {
 public:

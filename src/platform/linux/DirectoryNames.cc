@@ -4,6 +4,7 @@
 #include "platform/FileDescriptor.h"
 
 #include <algorithm>
+#include <cerrno>
 #include <dirent.h>
 #include <fcntl.h>
 #include <memory>
@@ -17,20 +18,30 @@ struct DirectoryCloser {
 };
 } // namespace
 
-std::vector<std::string> directoryNames(int directory) {
+std::expected<std::vector<std::string>, int> directoryNames(int directory) {
     std::vector<std::string> names;
     FileDescriptor own(::openat(directory, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     const std::unique_ptr<DIR, DirectoryCloser> stream(own.valid() ? ::fdopendir(own.get()) : nullptr);
     if (!stream)
-        return names;
+        return std::unexpected(errno);
     (void)own.release();
-    while (const dirent* const entry = ::readdir(stream.get())) {
+    for (;;) {
+        errno = 0;
+        const dirent* const entry = ::readdir(stream.get());
+        if (!entry && errno != 0)
+            return std::unexpected(errno);
+        if (!entry)
+            break;
         const std::string_view name = entry->d_name;
         if (name != "." && name != "..")
             names.emplace_back(name);
     }
     std::ranges::sort(names);
     return names;
+}
+
+std::vector<std::string> directoryNamesIfAny(int directory) {
+    return directoryNames(directory).value_or(std::vector<std::string>());
 }
 
 } // namespace zor::platform

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/linux/FileDeviceLockState.h"
 
+#include "platform/Shortage.h"
 #include "platform/linux/Inotify.h"
 #include "platform/linux/Names.h"
 #include "platform/linux/Openat2.h"
@@ -10,12 +11,16 @@
 #include <charconv>
 #include <fcntl.h>
 #include <sys/inotify.h>
+#include <sys/timerfd.h>
+#include <unistd.h>
 
 namespace zor::platform {
 
 namespace {
 
 constexpr std::size_t stateBytesMax = 32;
+/// A shortage that is over by then is hardly noticed, and one that lasts costs next to nothing.
+constexpr long againNanoseconds = 100'000'000;
 /// A file that was changed twice within one tick of the kernel's clock looks the same after both; one that was left
 /// alone for as long as this will not.
 constexpr time_t settledSeconds = 1;
@@ -39,7 +44,7 @@ bool FileDeviceLockState::Known::isOf(const struct stat& status) const {
 int FileDeviceLockState::currentState() const {
     struct stat status{};
     if (::fstatat(root_.runtimeDirectory(), names::lockState, &status, AT_SYMLINK_NOFOLLOW) != 0)
-        return errno == ENOENT ? 0 : unknown;
+        return stateUnread(errno);
     {
         const MutexLock held(mutex_);
         if (known_ && known_->isOf(status))
@@ -51,12 +56,14 @@ int FileDeviceLockState::currentState() const {
 int FileDeviceLockState::readState() const {
     const auto file = openBeneath(root_.runtimeDirectory(), names::lockState, O_RDONLY | O_NONBLOCK);
     if (!file)
-        return file.error() == ENOENT ? 0 : unknown;
+        return stateUnread(file.error());
     struct stat status{};
     timespec now{};
     const bool examined = ::fstat(file->get(), &status) == 0 && ::clock_gettime(CLOCK_REALTIME, &now) == 0;
     const auto text = readSmallFile(file->get(), stateBytesMax);
-    const int state = text ? parseState(*text) : unknown;
+    if (!text)
+        return stateUnread(text.error());
+    const int state = parseState(*text);
     const MutexLock held(mutex_);
     known_.reset();
     if (examined && status.st_ctim.tv_sec + settledSeconds < now.tv_sec)
@@ -68,6 +75,16 @@ int FileDeviceLockState::readState() const {
     return state;
 }
 
+int FileDeviceLockState::stateUnread(int error) const {
+    if (error == ENOENT)
+        return unlocked;
+    if (isOwnShortage(error) && again_.valid()) {
+        const itimerspec moment{.it_interval = {}, .it_value = {.tv_sec = 0, .tv_nsec = againNanoseconds}};
+        (void)::timerfd_settime(again_.get(), 0, &moment, nullptr);
+    }
+    return unknown;
+}
+
 const char* FileDeviceLockState::notificationName() const {
     return names::lockState;
 }
@@ -76,10 +93,17 @@ int FileDeviceLockState::registerForChanges(RunLoop& loop, std::function<void()>
     inotify_.reset(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
     if (!inotify_.valid())
         return errno;
+    again_.reset(::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK));
+    if (!again_.valid())
+        return errno;
     if (const auto watch = watchDirectory(inotify_.get(), root_.runtimeDirectory(), watchedEvents); !watch)
         return watch.error();
-    const bool watched = loop.watch(inotify_.get(), [this, changed = std::move(changed)] {
+    const bool watched = loop.watch(inotify_.get(), [this, changed] {
         if (takeEvents())
+            changed();
+    }) && loop.watch(again_.get(), [this, changed] {
+        std::uint64_t expirations = 0;
+        if (::read(again_.get(), &expirations, sizeof expirations) == sizeof expirations)
             changed();
     });
     return watched ? 0 : ENOMEM;

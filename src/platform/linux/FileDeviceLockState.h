@@ -2,7 +2,9 @@
 // The lock state as the number in run/zorvane/lockstate, which whoever manages the lock replaces by rename.
 //
 // No file is 0, unlocked. A file that holds no number is -1: neither locked nor unlocked, so nothing that waits for an
-// unlock starts, and nothing begins to wait for one that may never be said. What was read is kept for as long as the
+// unlock starts, and nothing begins to wait for one that may never be said. It is -1 too when there is no descriptor or
+// no memory to look with; then the loop is told a moment later, as of a change, for nobody will change it again because
+// a notice was not understood. What was read is kept for as long as the
 // file is the same and unchanged, which is looked up each time: a change of protection class asks for every file. Any
 // thread.
 #pragma once
@@ -40,10 +42,14 @@ private:
         [[nodiscard]] bool isOf(const struct stat& status) const;
     };
     [[nodiscard]] int readState() const;
+    /// What a look that failed says.
+    [[nodiscard]] int stateUnread(int error) const;
     [[nodiscard]] bool takeEvents() const;
 
     const SystemRoot& root_;
     FileDescriptor inotify_;
+    /// Runs out a moment after a look that a shortage prevented.
+    FileDescriptor again_;
     mutable Mutex mutex_;
     mutable std::optional<Known> known_ ZOR_GUARDED_BY(mutex_);
 };

@@ -84,29 +84,34 @@ bool IdentityRegistry::lookAgain() {
 }
 
 void IdentityRegistry::lookAtNotices() {
-    if (!hasLooked_)
-        return look(Read::all);
     const RegistryWatches::Noticed noticed = watches_.take();
+    const bool mayHaveMissed = !hasLooked_ || !watches_.isComplete();
     if (noticed != RegistryWatches::Noticed::nothing)
         look(noticed == RegistryWatches::Noticed::registry ? Read::all : Read::changed);
-    else if (!watches_.isComplete() && coarseMilliseconds() - lookedMilliseconds_ >= lookAgainMilliseconds)
+    else if (mayHaveMissed && coarseMilliseconds() - lookedMilliseconds_ >= lookAgainMilliseconds)
         look(Read::changed);
 }
 
 void IdentityRegistry::look(Read read) {
     lookedMilliseconds_ = coarseMilliseconds();
     dueMilliseconds_.store(lookedMilliseconds_ + lookEveryMilliseconds, std::memory_order_relaxed);
-    if (read == Read::changed && hasLooked_ && looksUnchanged(*snapshot()))
+    // What a look could not finish is read whole by the next one: the notice that it was for has been taken.
+    if (!hasLooked_)
+        read = Read::all;
+    else if (read == Read::changed && looksUnchanged(*snapshot()))
         return;
-    hasLooked_ = true;
+    hasLooked_ = false;
     // A watch comes before the look at what it watches: what changes in between is then told, and read once more.
     watches_.begin();
     watches_.watchRegistry();
     RegistryListing listing = directory_.list();
-    std::vector<std::string> problems;
-    if (!listing.problem.empty())
-        problems.push_back(formatted("%s %s", names::identityDirectory, listing.problem.c_str()));
+    std::vector<RegistryProblem> problems;
+    if (listing.problem)
+        problems.push_back({.text = formatted("%s %s", names::identityDirectory, listing.problem->text.c_str()),
+                            .isShortage = listing.problem->isShortage});
     std::vector<Registered> entries = readEntries(listing, read, problems);
+    if (std::ranges::any_of(problems, &RegistryProblem::isShortage))
+        return sayProblems(std::move(problems));
     for (Registered& registered : entries) {
         watches_.watchExecutable(registered.entry->executable);
         registered.executable = executableAt(registered.entry->executable);
@@ -114,6 +119,7 @@ void IdentityRegistry::look(Read read) {
     watches_.end();
     listing_ = std::move(listing);
     publish(std::move(entries));
+    hasLooked_ = true;
     sayProblems(std::move(problems));
 }
 
@@ -124,7 +130,7 @@ bool IdentityRegistry::looksUnchanged(const Snapshot& old) const {
 }
 
 std::vector<IdentityRegistry::Registered> IdentityRegistry::readEntries(const RegistryListing& listing, Read read,
-                                                                        std::vector<std::string>& problems) {
+                                                                        std::vector<RegistryProblem>& problems) {
     std::vector<Registered> entries;
     const auto old = snapshot();
     std::size_t bytesLeft = allBytesMax;
@@ -134,14 +140,15 @@ std::vector<IdentityRegistry::Registered> IdentityRegistry::readEntries(const Re
         const bool isAsBefore = entry && before != listing_.files.end() && before->second == stamp;
         const auto bytes = static_cast<std::size_t>(stamp.bytes);
         if (bytes > bytesLeft) {
-            problems.push_back(formatted("%s is ignored: all files together are too large", name.c_str()));
+            problems.push_back({.text = formatted("%s is ignored: all files together are too large", name.c_str())});
             continue;
         }
         bytesLeft -= bytes;
         if (read == Read::all || !isAsBefore) {
             auto parsed = directory_.read(listing, name);
             if (!parsed) {
-                problems.push_back(formatted("%s is ignored: %s", name.c_str(), parsed.error().c_str()));
+                problems.push_back({.text = formatted("%s is ignored: %s", name.c_str(), parsed.error().text.c_str()),
+                                    .isShortage = parsed.error().isShortage});
                 continue;
             }
             // Who was granted the same keeps the same object.
@@ -162,10 +169,10 @@ void IdentityRegistry::publish(std::vector<Registered> entries) {
     generation_.store(generation, std::memory_order_release);
 }
 
-void IdentityRegistry::sayProblems(std::vector<std::string> problems) {
-    for (const std::string& problem : problems) {
+void IdentityRegistry::sayProblems(std::vector<RegistryProblem> problems) {
+    for (const RegistryProblem& problem : problems) {
         if (std::ranges::find(problemsSaid_, problem) == problemsSaid_.end())
-            log_.write(levelError, "IdentityRegistry", problem);
+            log_.write(levelError, "IdentityRegistry", problem.text);
     }
     problemsSaid_ = std::move(problems);
 }

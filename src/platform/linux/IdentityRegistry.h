@@ -9,6 +9,9 @@
 // executables lie in wake the main loop, and are looked at before a peer is judged anew. And once a second, when
 // somebody asks, everything is looked at again whatever the main loop is doing; that also finds what no notice tells.
 //
+// A look for which there was no descriptor or no memory changes nothing: what was known holds, and the next one who
+// asks looks again.
+//
 // What does not count (RegistryDirectory says what) is said in the log, once for each change. Any thread. `reading_` is
 // held while files are read, `publishing_` only to hand out the snapshot.
 #pragma once
@@ -76,9 +79,9 @@ private:
     void lookAtNotices() ZOR_REQUIRES(reading_);
     [[nodiscard]] bool looksUnchanged(const Snapshot& old) const ZOR_REQUIRES(reading_);
     [[nodiscard]] std::vector<Registered> readEntries(const RegistryListing& listing, Read read,
-                                                      std::vector<std::string>& problems) ZOR_REQUIRES(reading_);
+                                                      std::vector<RegistryProblem>& problems) ZOR_REQUIRES(reading_);
     void publish(std::vector<Registered> entries) ZOR_REQUIRES(reading_);
-    void sayProblems(std::vector<std::string> problems) ZOR_REQUIRES(reading_);
+    void sayProblems(std::vector<RegistryProblem> problems) ZOR_REQUIRES(reading_);
 
     PlatformLog& log_;
     const RegistryDirectory directory_;
@@ -89,8 +92,9 @@ private:
     Mutex reading_;
     RegistryWatches watches_ ZOR_GUARDED_BY(reading_);
     RegistryListing listing_ ZOR_GUARDED_BY(reading_);
-    std::vector<std::string> problemsSaid_ ZOR_GUARDED_BY(reading_);
+    std::vector<RegistryProblem> problemsSaid_ ZOR_GUARDED_BY(reading_);
     std::int64_t lookedMilliseconds_ ZOR_GUARDED_BY(reading_) = 0;
+    /// The last look was at everything that is published.
     bool hasLooked_ ZOR_GUARDED_BY(reading_) = false;
     const int noticeDescriptor_;
 

@@ -78,7 +78,7 @@ int LinkSandboxUserState::setMapping(std::uint32_t userId, SandboxItemType type,
 unsigned LinkSandboxUserState::removeDanglingMappings() {
     unsigned removed = 0;
     forEachSandboxDirectory(root_, [&](const SandboxDirectory& directory) {
-        for (const std::string& name : directoryNames(directory.descriptor)) {
+        for (const std::string& name : directoryNamesIfAny(directory.descriptor)) {
             if (isSandboxLeftover(name))
                 (void)disk_.unlinkFile(directory.descriptor, name.c_str());
             else if (isDanglingSandboxLink(root_, directory.descriptor, name.c_str()) &&

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/linux/LinuxPeer.h"
 
+#include "platform/Shortage.h"
 #include "platform/linux/CgroupUnit.h"
 #include "platform/linux/SmallFile.h"
 
@@ -51,7 +52,7 @@ Identity LinuxPeer::identify(Explain explain) {
         judgement = judge(*snapshot, *now);
     }
     judgedExecutable_ = *now;
-    judgedGeneration_ = snapshot->generation;
+    judgedGeneration_ = judgement.decided ? snapshot->generation : 0;
     judgedGrant_ = judgement.grant;
     identity.grant = std::move(judgement.grant);
     if (explain == Explain::yes)
@@ -77,10 +78,17 @@ LinuxPeer::Judgement LinuxPeer::judge(const IdentityRegistry::Snapshot& snapshot
         if (IdentityRegistry::executableAt(registered.entry->executable) != executable)
             continue;
         judgement.named = true;
-        const std::string reason = mismatch(*registered.entry);
-        judgement.explanation += (judgement.explanation.empty() ? "" : "; ") + registered.fileName + ": " +
-                                 (reason.empty() ? "matches" : reason);
-        if (reason.empty()) {
+        const auto reason = mismatch(*registered.entry);
+        judgement.explanation += (judgement.explanation.empty() ? "" : "; ") + registered.fileName + ": ";
+        if (!reason) {
+            // No entry after it counts either: this may be the one.
+            judgement.decided = false;
+            judgement.explanation +=
+                std::string("the process cannot be examined: ") + ::strerrordesc_np(reason.error());
+            return judgement;
+        }
+        judgement.explanation += reason->empty() ? "matches" : *reason;
+        if (reason->empty()) {
             judgement.grant = registered.entry->grant;
             return judgement;
         }
@@ -90,26 +98,29 @@ LinuxPeer::Judgement LinuxPeer::judge(const IdentityRegistry::Snapshot& snapshot
     return judgement;
 }
 
-std::string LinuxPeer::mismatch(const RegistryEntry& entry) const {
+std::expected<std::string, int> LinuxPeer::mismatch(const RegistryEntry& entry) const {
     if (!entry.admitsUser(accepted_.reportedUserId))
         return "uid " + std::to_string(accepted_.reportedUserId) +
                (entry.userIds ? " is not one of its UserIDs" : " is not 0, and it names no UserIDs");
     if (entry.unit) {
-        if (const std::string actual = unit(); actual != *entry.unit)
-            return "the process is in unit \"" + actual + "\", not in \"" + *entry.unit + "\"";
+        const auto actual = unit();
+        if (!actual)
+            return std::unexpected(actual.error());
+        if (*actual != *entry.unit)
+            return "the process is in unit \"" + *actual + "\", not in \"" + *entry.unit + "\"";
     }
     if (entry.securityLabel && !accepted_.securityLabel)
         return "the kernel gives no security label";
     if (entry.securityLabel && entry.securityLabel != accepted_.securityLabel)
         return "the security label is \"" + *accepted_.securityLabel + "\"";
-    return {};
+    return std::string();
 }
 
-std::string LinuxPeer::unit() const {
+std::expected<std::string, int> LinuxPeer::unit() const {
     const FileDescriptor file(::openat(accepted_.process.get(), "cgroup", O_RDONLY | O_CLOEXEC));
-    if (!file.valid())
-        return {};
-    const auto text = readSmallFile(file.get(), cgroupBytesMax);
+    const auto text = file.valid() ? readSmallFile(file.get(), cgroupBytesMax) : std::unexpected(errno);
+    if (!text && isOwnShortage(text.error()))
+        return std::unexpected(text.error());
     return text ? systemUnitInCgroups(*text) : std::string();
 }
 

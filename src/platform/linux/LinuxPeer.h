@@ -43,12 +43,16 @@ private:
         std::shared_ptr<const IdentityGrant> grant;
         /// An entry names the executable, whether it matched or not.
         bool named = false;
+        /// False when it could not be told whether an entry matches: nothing is granted, and it is judged again.
+        bool decided = true;
         std::string explanation;
     };
     [[nodiscard]] Judgement judge(const IdentityRegistry::Snapshot& snapshot, const FileId& executable) const;
-    /// In words, what keeps the peer from being the one that the entry means; empty: nothing does.
-    [[nodiscard]] std::string mismatch(const RegistryEntry& entry) const;
-    [[nodiscard]] std::string unit() const;
+    /// In words, what keeps the peer from being the one that the entry means; empty: nothing does. An errno when there
+    /// was no descriptor or no memory to look.
+    [[nodiscard]] std::expected<std::string, int> mismatch(const RegistryEntry& entry) const;
+    /// Empty when it is in none; the same errnos.
+    [[nodiscard]] std::expected<std::string, int> unit() const;
     [[nodiscard]] std::string executableName() const;
 
     const Accepted accepted_;

@@ -1,15 +1,18 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/linux/LinuxPeerIdentity.h"
 
+#include "platform/Shortage.h"
 #include "platform/linux/LinuxPeer.h"
 
 #include <cerrno>
+#include <expected>
 #include <fcntl.h>
 #include <poll.h>
 #include <string>
 #include <sys/socket.h>
 #include <sys/syscall.h>
 #include <unistd.h>
+#include <utility>
 
 namespace zor::platform {
 
@@ -35,6 +38,12 @@ FileDescriptor processOfPeer(int socket, pid_t pid) {
     return FileDescriptor(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)));
 }
 
+std::expected<FileDescriptor, int> unlessShortage(int error) {
+    if (isOwnShortage(error))
+        return std::unexpected(error);
+    return FileDescriptor();
+}
+
 bool hasEnded(int pidfd) {
     pollfd ended{.fd = pidfd, .events = POLLIN, .revents = 0};
     int count = 0;
@@ -45,13 +54,16 @@ bool hasEnded(int pidfd) {
 }
 
 /// /proc/PID of the peer. It was the peer's when it was opened if the peer was alive afterwards; from then on the
-/// descriptor belongs to that process alone.
-FileDescriptor pinProcess(int socket, pid_t pid) {
+/// descriptor belongs to that process alone. Invalid when the peer has ended; an errno when there was no descriptor or
+/// no memory to look: a living peer would be nobody for as long as it is connected.
+std::expected<FileDescriptor, int> pinProcess(int socket, pid_t pid) {
     const FileDescriptor process = processOfPeer(socket, pid);
     if (!process.valid())
-        return {};
+        return unlessShortage(errno);
     const std::string path = "/proc/" + std::to_string(pid);
     FileDescriptor directory(::open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    if (!directory.valid())
+        return unlessShortage(errno);
     if (hasEnded(process.get()))
         directory.reset();
     return directory;
@@ -84,13 +96,20 @@ std::unique_ptr<Peer> LinuxPeerIdentity::peerOfSocket(int socket) {
     if (::getsockopt(socket, SOL_SOCKET, SO_PEERCRED, &credentials, &length) != 0)
         return nullptr;
     // 0 is a process that has no pid here: one outside of this pid namespace.
-    if (credentials.pid <= 0 || credentials.uid == static_cast<uid_t>(-1))
+    if (credentials.pid <= 0 || credentials.uid == static_cast<uid_t>(-1)) {
+        errno = ESRCH;
         return nullptr;
+    }
+    auto process = pinProcess(socket, credentials.pid);
+    if (!process) {
+        errno = process.error();
+        return nullptr;
+    }
     const bool isOwner = daemonUserId_ != 0 && ownsRoot(credentials.uid);
     return std::make_unique<LinuxPeer>(LinuxPeer::Accepted{.pid = credentials.pid,
                                                            .uid = credentials.uid,
                                                            .reportedUserId = isOwner ? 0 : credentials.uid,
-                                                           .process = pinProcess(socket, credentials.pid),
+                                                           .process = std::move(*process),
                                                            .securityLabel = securityLabelOf(socket)},
                                        registry_);
 }

@@ -12,6 +12,7 @@
 #include <cstdint>
 #include <expected>
 #include <map>
+#include <optional>
 #include <string>
 #include <sys/stat.h>
 
@@ -35,12 +36,20 @@ struct FileStamp {
     bool operator==(const FileStamp&) const = default;
 };
 
+/// Why something does not count.
+struct RegistryProblem {
+    std::string text;
+    /// It says nothing of the file or directory: there was no descriptor or no memory to look at it with.
+    bool isShortage = false;
+    bool operator==(const RegistryProblem&) const = default;
+};
+
 /// The registry's files by name, in the order in which they count; none of them has been read.
 struct RegistryListing {
     FileDescriptor directory;
     std::map<std::string, FileStamp> files;
-    /// In words, when something is wrong with the directory as a whole.
-    std::string problem;
+    /// When something is wrong with the directory as a whole.
+    std::optional<RegistryProblem> problem;
 
     [[nodiscard]] bool sameAs(const RegistryListing& other) const {
         return files == other.files && problem == other.problem;
@@ -55,12 +64,11 @@ public:
     RegistryDirectory(const SystemRoot& root, uid_t daemonUserId) : root_(root), daemonUserId_(daemonUserId) {}
 
     [[nodiscard]] RegistryListing list() const;
-    /// The entry, or in words why the file does not count.
-    [[nodiscard]] std::expected<RegistryEntry, std::string> read(const RegistryListing& listing,
-                                                                 const std::string& name) const;
+    [[nodiscard]] std::expected<RegistryEntry, RegistryProblem> read(const RegistryListing& listing,
+                                                                     const std::string& name) const;
 
 private:
-    [[nodiscard]] std::string ownershipProblem(const struct stat& status) const;
+    [[nodiscard]] std::optional<RegistryProblem> ownershipProblem(const struct stat& status) const;
 
     const SystemRoot& root_;
     const uid_t daemonUserId_;

@@ -17,11 +17,11 @@ void forEachSandboxDirectory(const SystemRoot& root, const std::function<void(co
     const auto top = openBeneath(root.runtimeDirectory(), names::sandboxDirectory, flags);
     if (!top)
         return;
-    for (const std::string& user : directoryNames(top->get())) {
+    for (const std::string& user : directoryNamesIfAny(top->get())) {
         const auto userDirectory = openBeneath(top->get(), user.c_str(), flags);
         if (!userDirectory)
             continue;
-        for (const std::string& itemType : directoryNames(userDirectory->get()))
+        for (const std::string& itemType : directoryNamesIfAny(userDirectory->get()))
             if (const auto directory = openBeneath(userDirectory->get(), itemType.c_str(), flags))
                 found({.descriptor = directory->get(), .user = user, .itemType = itemType});
     }

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/linux/SeqpacketUpcallPort.h"
 
+#include "platform/Shortage.h"
 #include "platform/linux/Names.h"
 
 #include <algorithm>
@@ -96,6 +97,9 @@ void SeqpacketUpcallPort::acceptConnections() {
         (void)raiseSendBuffer(fd);
         (void)enableSenderCredentials(fd);
         auto peer = identity_.peerOfSocket(fd);
+        // The kernel's agent would be nobody as long as it is connected. Closed, it connects again.
+        if (!peer && isOwnShortage(errno))
+            continue;
         connections_[fd] = {.socket = std::move(accepted.socket), .peer = std::move(peer)};
         if (!loop_->watch(fd, [this, fd] { serveConnection(fd); }))
             connections_.erase(fd);
