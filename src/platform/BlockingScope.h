@@ -12,8 +12,9 @@ namespace zor::platform {
 class BlockingObserver {
 public:
     virtual ~BlockingObserver() = default;
-    virtual void willBlock() = 0;
-    virtual void didBlock() = 0;
+    // They do not fail: who opens a scope may have counted himself already as one that waits.
+    virtual void willBlock() noexcept = 0;
+    virtual void didBlock() noexcept = 0;
 
     /// Makes `observer` (or nobody, with nullptr) the one that the scopes of this thread tell.
     static void setForThisThread(BlockingObserver* observer);

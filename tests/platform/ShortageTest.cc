@@ -1,19 +1,61 @@
 // SPDX-License-Identifier: Apache-2.0
-// A process without descriptors: what it could not look at it does not take for absent.
+// A process without descriptors, or without memory: what it could not look at it does not take for absent, and what one
+// client's request lacked ends that client's connection and nothing else.
+#include "platform/BlockingScope.h"
+#include "platform/ListenerWorld.h"
 #include "platform/PeerProcess.h"
 #include "platform/linux/EpollRunLoop.h"
 #include "platform/linux/FileDeviceLockState.h"
 #include "platform/linux/LinuxPeerIdentity.h"
+#include "platform/linux/ListenerPool.h"
 #include "platform/linux/Names.h"
 #include "platform/linux/SeqpacketUpcallPort.h"
 #include "store/FewDescriptors.h"
 #include "support/RecordingLog.h"
 
-#include <atomic>
+#include <cstdlib>
+#include <functional>
+#include <future>
+#include <limits>
+#include <new>
+#include <optional>
+
+// ThreadSanitizer has an operator new of its own and lets nobody replace it.
+#if defined(__has_feature)
+#if __has_feature(thread_sanitizer)
+#define ZOR_OPERATOR_NEW_IS_TAKEN
+#endif
+#endif
+
+namespace {
+constexpr std::size_t everything = std::numeric_limits<std::size_t>::max();
+std::atomic<std::size_t> bytesRefusedFrom{everything};
+} // namespace
+
+#ifndef ZOR_OPERATOR_NEW_IS_TAKEN
+
+void* operator new(std::size_t size) {
+    void* memory = size < bytesRefusedFrom.load(std::memory_order_relaxed) ? std::malloc(size) : nullptr;
+    if (memory == nullptr)
+        throw std::bad_alloc();
+    return memory;
+}
+
+void operator delete(void* memory) noexcept {
+    std::free(memory);
+}
+
+void operator delete(void* memory, std::size_t) noexcept {
+    std::free(memory);
+}
+
+#endif
 
 namespace zor::platform {
 namespace {
 
+using test::ListenerWorld;
+using test::RawClient;
 using zor::test::FewDescriptors;
 
 /// A registry with one program, and whoever runs it.
@@ -127,6 +169,86 @@ TEST(WantOfDescriptors, AnUnlockIsSeenAfterwards) {
     loop.stop();
     runner.join();
 }
+
+#ifndef ZOR_OPERATOR_NEW_IS_TAKEN
+
+/// While it lives, nothing of this size or more can be allocated.
+class NothingLarge {
+public:
+    explicit NothingLarge(std::size_t bytes) { bytesRefusedFrom = bytes; }
+    ~NothingLarge() { bytesRefusedFrom = everything; }
+    NothingLarge(const NothingLarge&) = delete;
+    NothingLarge& operator=(const NothingLarge&) = delete;
+};
+
+// Goal: where memory runs out for a request or its reply, one connection ends, charges balance, and others are served.
+// Method: a handler that throws, a request and a reply that are too large, and replies that pile up unread.
+TEST(WantOfMemory, EndsOneConnection) {
+    constexpr std::size_t large = 100'000;
+    ListenerWorld world;
+    world.start([](PeerConnection&, ServiceEvent& event) {
+        const std::uint64_t asked = event.request.unsignedInteger("Bytes").value_or(0);
+        if (event.request.isTrue("Throw"))
+            throw std::bad_alloc();
+        if (asked == 0)
+            return event.reply->send(event.request);
+        const plist::Dictionary reply{{"Data", plist::Data(asked)}};
+        const NothingLarge limit(large);
+        event.reply->send(reply);
+    });
+    const auto throws = [](RawClient& client) { return client.send({{"Throw", true}}, 1); };
+    const auto replies = [](RawClient& client) { return client.send({{"Bytes", std::uint64_t{3 * large}}}, 1); };
+    const auto pilesUp = [](RawClient& client) {
+        for (std::uint64_t i = 0; i < 100 && client.send({{"Bytes", std::uint64_t{large / 2}}}, i); ++i)
+            ;
+        ::usleep(100'000);
+        while (client.receive()) {
+        }
+        return true;
+    };
+    const auto requests = [](RawClient& client) {
+        plist::Data half = test::frameOf(3 * large, ipc::frameExpectsReply, 1, plist::Data(2 * large));
+        const NothingLarge limit(large);
+        return client.send(half) && client.ended();
+    };
+    RawClient bystander(world.socketPath());
+    for (const std::function<bool(RawClient&)>& act :
+         {std::function<bool(RawClient&)>(throws), std::function<bool(RawClient&)>(replies),
+          std::function<bool(RawClient&)>(pilesUp), std::function<bool(RawClient&)>(requests)}) {
+        RawClient client(world.socketPath());
+        EXPECT_TRUE(act(client));
+        EXPECT_TRUE(client.ended());
+        EXPECT_TRUE(bystander.isServed());
+    }
+    EXPECT_EQ(world.listener().counters().connectionsDropped, 4U);
+    bystander.close();
+    EXPECT_TRUE(world.isAtRest());
+}
+
+// Goal: a handler that is about to wait while there is no memory for another thread waits all the same, and the thread
+// comes when there is. Method: the only thread waits, and a second client asks.
+TEST(WantOfMemory, AThreadComesLater) {
+    ListenerWorld world;
+    world.limits.threadsRunning = 1;
+    std::promise<void> gate;
+    world.start([opened = gate.get_future().share()](PeerConnection&, ServiceEvent& event) {
+        if (event.request == test::numbered(1)) {
+            std::optional<NothingLarge> limit(listenerScratchBytes);
+            const BlockingScope blocking;
+            limit.reset();
+            opened.wait();
+        }
+        event.reply->send(event.request);
+    });
+    RawClient waits(world.socketPath());
+    ASSERT_TRUE(waits.send(test::numbered(1), 1));
+    RawClient asks(world.socketPath());
+    EXPECT_TRUE(asks.isServed());
+    gate.set_value();
+    EXPECT_TRUE(waits.receive());
+}
+
+#endif
 
 } // namespace
 } // namespace zor::platform

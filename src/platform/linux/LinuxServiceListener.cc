@@ -1,10 +1,12 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/linux/LinuxServiceListener.h"
 
+#include "platform/Shortage.h"
 #include "platform/linux/ListenerCore.h"
 
 #include <cerrno>
 #include <chrono>
+#include <new>
 #include <sys/epoll.h>
 #include <sys/socket.h>
 #include <unistd.h>
@@ -57,23 +59,31 @@ private:
         if (::getsockopt(socket.get(), SOL_SOCKET, SO_PEERCRED, &credentials, &length) != 0)
             return core_.incidents.happened(ListenerIncident::unknownPeer, errno);
         // The charge comes before anything that costs more.
-        ListenerCharges::Account* account =
-            core_.charges.openConnection(credentials.uid, identity_.ownsRoot(credentials.uid));
-        if (!account)
-            return core_.incidents.happened(ListenerIncident::tooManyConnections, credentials.uid);
-        std::unique_ptr<Peer> peer = identity_.peerOfSocket(socket.get());
-        if (!peer) {
-            core_.incidents.happened(ListenerIncident::unknownPeer, errno);
-            return core_.charges.closeConnection(*account);
+        ListenerCharges::Account* account = nullptr;
+        std::unique_ptr<Peer> peer;
+        std::shared_ptr<ListenerConnection> connection;
+        int error = 0;
+        try {
+            account = core_.charges.openConnection(credentials.uid, identity_.ownsRoot(credentials.uid));
+            if (!account)
+                return core_.incidents.happened(ListenerIncident::tooManyConnections, credentials.uid);
+            peer = identity_.peerOfSocket(socket.get());
+            // Who connected before the listening socket came to the daemon has not taken it over. What such a one has
+            // sent would come with descriptors in the place of credentials.
+            error = peer ? enableSenderCredentials(socket.get()) : errno;
+            if (error == 0)
+                connection = core_.unusedConnection();
+        } catch (const std::bad_alloc&) {
+            error = ENOMEM; // refused like one for which there is no descriptor
         }
-        // Who connected before the listening socket came to the daemon has not taken it over. What such a one has sent
-        // would come with descriptors in the place of credentials.
-        if (const int error = enableSenderCredentials(socket.get()); error != 0) {
-            core_.incidents.happened(ListenerIncident::unknownPeer, error);
-            return core_.charges.closeConnection(*account);
+        if (connection) {
+            ++core_.accepted;
+            return connection->open(std::move(socket), std::move(peer), *account);
         }
-        ++core_.accepted;
-        core_.unusedConnection()->open(std::move(socket), std::move(peer), *account);
+        core_.incidents.happened(
+            isOwnShortage(error) ? ListenerIncident::outOfDescriptors : ListenerIncident::unknownPeer, error);
+        if (account)
+            core_.charges.closeConnection(*account);
     }
 
     const int socket_;
@@ -155,7 +165,7 @@ ListenerCounters LinuxServiceListener::counters() const {
             .brokenFrames = count(ListenerIncident::brokenFrame),
             .foreignSenders = count(ListenerIncident::foreignSender),
             .connectionsDropped = count(ListenerIncident::tooMuchInput) + count(ListenerIncident::tooMuchOutput) +
-                                  count(ListenerIncident::unwritableReply),
+                                  count(ListenerIncident::unwritableReply) + count(ListenerIncident::unservable),
             .inputBytes = totals.inputBytes,
             .outputBytes = totals.outputBytes,
             .threads = pool.threads,

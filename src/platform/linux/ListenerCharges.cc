@@ -38,11 +38,12 @@ ListenerCharges::Account* ListenerCharges::openConnection(uid_t uid, bool ownsRo
             return nullptr;
         if (found != accounts_.end() && found->second.connections >= limits_.connectionsMaxPerUser)
             return nullptr;
-        ++ofOthers_.connections;
     }
     Account& account = found != accounts_.end() ? found->second : accounts_[uid];
     account.uid = uid;
     account.ownsRoot = ownsRoot;
+    if (!ownsRoot)
+        ++ofOthers_.connections;
     ++account.connections;
     ++totals_.connections;
     return &account;

@@ -5,6 +5,7 @@
 #include "platform/linux/ListenerCore.h"
 #include "plist/Binary.h"
 
+#include <exception>
 #include <sys/epoll.h>
 #include <sys/socket.h>
 #include <utility>
@@ -25,11 +26,16 @@ public:
 
     void send(const plist::Dictionary& reply) override {
         thread_local plist::Data frame;
-        frame.resize(ipc::frameHeaderBytes);
-        if (plist::appendBinary(reply, frame) && frame.size() - ipc::frameHeaderBytes <= ipc::replyPayloadBytesMax)
-            connection->transmit(*this, frame);
-        else
+        try {
+            frame.resize(ipc::frameHeaderBytes);
+            if (plist::appendBinary(reply, frame) && frame.size() - ipc::frameHeaderBytes <= ipc::replyPayloadBytesMax)
+                connection->transmit(*this, frame);
+            else
+                connection->unwritable(*this);
+        } catch (const std::exception&) {
+            // Here, because the thread may be a queue's, which has nobody to tell.
             connection->unwritable(*this);
+        }
         if (frame.capacity() > replyBufferBytesKept)
             plist::Data().swap(frame);
     }
@@ -82,7 +88,17 @@ void ListenerConnection::run(ListenerScratch& scratch, std::uint32_t events) {
         if (output_.pendingBytes() > 0 && output_.flush(descriptor_) == ListenerOutput::Result::broken)
             dropLocked();
     }
-    finish(serve(scratch));
+    Outcome outcome = Outcome::end;
+    try {
+        outcome = keepRest(serve(scratch));
+        if (outcome == Outcome::requeue)
+            return core_.pool.requeue(*this);
+    } catch (const std::exception&) {
+        // One request less is better than no daemon. Its peer learns at once that there will be no reply.
+        outcome = endWithIncident(ListenerIncident::unservable, peer_->pid());
+    }
+    if (outcome == Outcome::end || !letGo())
+        close();
 }
 
 ListenerConnection::Outcome ListenerConnection::serve(ListenerScratch& scratch) {
@@ -179,13 +195,10 @@ std::uint32_t ListenerConnection::eventsWanted() const {
     return pending < core_.limits.outputBytesPaused ? std::uint32_t{EPOLLIN | EPOLLOUT} : std::uint32_t{EPOLLOUT};
 }
 
-void ListenerConnection::finish(Outcome outcome) {
+ListenerConnection::Outcome ListenerConnection::keepRest(Outcome outcome) {
     if (outcome != Outcome::end && !input_.keep())
-        outcome = endWithIncident(ListenerIncident::tooMuchInput, static_cast<std::int64_t>(peer_->kernelUserId()));
-    if (outcome == Outcome::requeue)
-        return core_.pool.requeue(*this);
-    if (outcome == Outcome::end || !letGo())
-        close();
+        return endWithIncident(ListenerIncident::tooMuchInput, static_cast<std::int64_t>(peer_->kernelUserId()));
+    return outcome;
 }
 
 bool ListenerConnection::letGo() {
@@ -267,12 +280,13 @@ void ListenerConnection::transmit(Channel& channel, plist::Data& frame) {
     const MutexLock lock(mutex_);
     if (channel.sent || channel.life != life_ || !open_ || over_)
         return;
-    channel.sent = true;
     const ipc::FrameHeader header = {.payloadBytes = static_cast<std::uint32_t>(frame.size() - ipc::frameHeaderBytes),
                                      .flags = ipc::frameIsReply,
                                      .id = channel.id};
     ipc::encodeFrameHeader(header, std::span(frame).first<ipc::frameHeaderBytes>());
-    switch (output_.write(socket_.get(), frame)) {
+    const ListenerOutput::Result result = output_.write(socket_.get(), frame);
+    channel.sent = true;
+    switch (result) {
     case ListenerOutput::Result::done:
         return;
     case ListenerOutput::Result::kept:

@@ -59,6 +59,8 @@ private:
     };
 
     Outcome serve(ListenerScratch& scratch);
+    /// Keeps what has arrived of the next request, whatever the worker's scratch buffer is used for meanwhile.
+    Outcome keepRest(Outcome outcome);
     /// Serves the frames that have arrived whole. nullopt when more has to be received.
     std::optional<Outcome> serveArrived(ListenerScratch& scratch, unsigned& framesLeft);
     /// False when it was no request.
@@ -66,7 +68,6 @@ private:
     Outcome endWithOther(ListenerIncident incident);
     Outcome endWithIncident(ListenerIncident incident, std::int64_t about);
     std::shared_ptr<Channel> channelFor(std::uint64_t id) ZOR_EXCLUDES(mutex_);
-    void finish(Outcome outcome) ZOR_EXCLUDES(mutex_);
     /// Gives the connection back to epoll. False when it has to be closed instead.
     bool letGo() ZOR_EXCLUDES(mutex_);
     void close() ZOR_EXCLUDES(mutex_);

@@ -5,8 +5,11 @@ namespace zor::platform {
 
 std::shared_ptr<ListenerConnection> ListenerCore::unusedConnection() {
     const MutexLock lock(mutex);
-    if (unused.empty())
+    if (unused.empty()) {
+        // So that its end needs no memory.
+        unused.reserve(connections.size() + 1);
         return connections.emplace_back(std::make_shared<ListenerConnection>(*this));
+    }
     ListenerConnection* connection = unused.back();
     unused.pop_back();
     return connection->shared_from_this();

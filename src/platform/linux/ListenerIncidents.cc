@@ -4,6 +4,7 @@
 #include "platform/Format.h"
 
 #include <chrono>
+#include <exception>
 #include <string>
 
 namespace zor::platform {
@@ -29,6 +30,8 @@ std::string lineOf(ListenerIncident incident, std::int64_t about) {
         return formatted("Connection ended, too many bytes of unread replies: uid %lld", number);
     case ListenerIncident::unwritableReply:
         return formatted("A reply could not be written: uid %lld", number);
+    case ListenerIncident::unservable:
+        return formatted("Connection ended, its request could not be served: pid %lld", number);
     }
     return {};
 }
@@ -40,7 +43,7 @@ std::int64_t secondsNow() {
 
 } // namespace
 
-void ListenerIncidents::happened(ListenerIncident incident, std::int64_t about) {
+void ListenerIncidents::happened(ListenerIncident incident, std::int64_t about) noexcept {
     const auto index = static_cast<std::size_t>(incident);
     Kind& kind = kinds_[index];
     const std::uint64_t count = ++kind.count;
@@ -49,10 +52,14 @@ void ListenerIncidents::happened(ListenerIncident incident, std::int64_t about) 
     if (!report_ || last == now || !kind.toldAtSeconds.compare_exchange_strong(last, now))
         return;
     const std::uint64_t told = kind.countTold.exchange(count);
-    std::string line = lineOf(incident, about);
-    if (count > told + 1)
-        line += formatted(" (and %llu more before)", static_cast<unsigned long long>(count - told - 1));
-    report_(line);
+    try {
+        std::string line = lineOf(incident, about);
+        if (count > told + 1)
+            line += formatted(" (and %llu more before)", static_cast<unsigned long long>(count - told - 1));
+        report_(line);
+    } catch (const std::exception&) {
+        return; // the next line of this kind is due in a second
+    }
 }
 
 std::uint64_t ListenerIncidents::count(ListenerIncident incident) const {

@@ -28,10 +28,12 @@ enum class ListenerIncident : std::uint8_t {
     tooMuchInput,
     /// A peer left more of its replies unread than is kept.
     tooMuchOutput,
-    /// A reply that cannot be written: a fault of the daemon.
+    /// A reply that cannot be written: a fault of the daemon, or it has no memory for it.
     unwritableReply,
+    /// A request could not be served to its end, mostly for want of memory.
+    unservable,
 };
-inline constexpr std::size_t listenerIncidentKinds = 8;
+inline constexpr std::size_t listenerIncidentKinds = 9;
 
 /// Gets a line for the log. Any thread, one call at a time for each kind.
 using ListenerReport = std::function<void(std::string_view line)>;
@@ -39,8 +41,8 @@ using ListenerReport = std::function<void(std::string_view line)>;
 class ListenerIncidents {
 public:
     explicit ListenerIncidents(ListenerReport report) : report_(std::move(report)) {}
-    /// `about` is the uid or the pid that the incident is about.
-    void happened(ListenerIncident incident, std::int64_t about);
+    /// `about` is the uid or the pid that the incident is about. Without memory the line is left out, not the count.
+    void happened(ListenerIncident incident, std::int64_t about) noexcept;
     [[nodiscard]] std::uint64_t count(ListenerIncident incident) const;
 
 private:

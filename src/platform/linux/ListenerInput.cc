@@ -51,13 +51,14 @@ void ListenerInput::close() {
 bool ListenerInput::resizeKept(std::size_t capacity) {
     if (capacity == keptCapacity_)
         return true;
+    // Before the charge: where there is no memory nothing has been charged.
+    std::unique_ptr<std::uint8_t[]> other;
+    if (capacity > 0)
+        other = std::make_unique_for_overwrite<std::uint8_t[]>(capacity);
     if (!charges_->changeInput(*account_, keptCapacity_, capacity))
         return false;
-    std::unique_ptr<std::uint8_t[]> other;
-    if (capacity > 0) {
-        other = std::make_unique_for_overwrite<std::uint8_t[]>(capacity);
+    if (capacity > 0)
         std::copy(kept_.get() + keptBegin_, kept_.get() + keptEnd_, other.get());
-    }
     keptEnd_ -= std::exchange(keptBegin_, 0);
     kept_ = std::move(other);
     keptCapacity_ = capacity;

@@ -62,20 +62,24 @@ ListenerOutput::Result ListenerOutput::write(int socket, plist::Data& frame) {
         if (sent == frame.size())
             return Result::done;
     }
-    if (!charge(pendingBytes() + frame.size() - sent))
-        return Result::tooMuch;
+    const std::size_t unsent = frame.size() - sent;
     if (kept_.empty()) {
         kept_.swap(frame);
         begin_ = sent;
-        return Result::kept;
+    } else {
+        append(frame);
     }
+    // Afterwards: where there is no memory nothing has been charged.
+    return charge(pendingBytes() + unsent) ? Result::kept : Result::tooMuch;
+}
+
+void ListenerOutput::append(const plist::Data& frame) {
     // What was sent goes when it is the larger part, so each byte is moved about once.
     if (begin_ > kept_.size() / 2) {
         kept_.erase(kept_.begin(), kept_.begin() + static_cast<std::ptrdiff_t>(begin_));
         begin_ = 0;
     }
     kept_.insert(kept_.end(), frame.begin(), frame.end());
-    return Result::kept;
 }
 
 ListenerOutput::Result ListenerOutput::flush(int socket) {

@@ -27,13 +27,15 @@ public:
     [[nodiscard]] std::size_t pendingBytes() const { return pendingBytes_.load(std::memory_order_relaxed); }
 
     enum class Result { done, kept, broken, tooMuch };
-    /// Sends a frame behind what is kept. `frame` may be left with anything in it.
+    /// Sends a frame behind what is kept. `frame` may be left with anything in it. After broken and tooMuch what is
+    /// kept is to be discarded. Throws std::bad_alloc, and has done nothing then.
     [[nodiscard]] Result write(int socket, plist::Data& frame);
     /// Sends once of what is kept.
     [[nodiscard]] Result flush(int socket);
 
 private:
     [[nodiscard]] bool charge(std::size_t bytes);
+    void append(const plist::Data& frame);
 
     ListenerCharges* charges_ = nullptr;
     ListenerCharges::Account* account_ = nullptr;

@@ -6,13 +6,14 @@
 #include <csignal>
 #include <cstdio>
 #include <ctime>
+#include <exception>
 #include <fcntl.h>
+#include <new>
 #include <poll.h>
 #include <pthread.h>
 #include <string_view>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
-#include <system_error>
 #include <unistd.h>
 #include <utility>
 
@@ -23,7 +24,7 @@ namespace {
 constexpr std::uint64_t phaseMask = 3;
 constexpr std::uint64_t oneTask = 4;
 
-/// A thread that takes no signals: those belong to the main thread. False when the system gives none.
+/// A thread that takes no signals: those belong to the main thread. False when the system gives none, or no memory.
 bool startThreadWithoutSignals(std::thread& thread, const char* name, std::function<void()> body) {
     sigset_t all;
     sigset_t before;
@@ -33,7 +34,7 @@ bool startThreadWithoutSignals(std::thread& thread, const char* name, std::funct
     try {
         thread = std::thread(std::move(body));
         pthread_setname_np(thread.native_handle(), name);
-    } catch (const std::system_error&) {
+    } catch (const std::exception&) {
         started = false;
     }
     pthread_sigmask(SIG_SETMASK, &before, nullptr);
@@ -78,6 +79,9 @@ bool ListenerPool::start() {
     if (!startThreadWithoutSignals(watcher_, "listener-watch", [this] { watch(); }))
         return false;
     const MutexLock lock(mutex_);
+    // So that keeping a thread that runs, or one that has ended, never fails.
+    workers_.reserve(threadsMax_);
+    ended_.reserve(threadsMax_);
     while (addWorkerLocked()) {
     }
     return !workers_.empty();
@@ -249,7 +253,7 @@ bool ListenerPool::parkWhileEnoughRun(Worker& worker) {
     return true;
 }
 
-void ListenerPool::Worker::willBlock() {
+void ListenerPool::Worker::willBlock() noexcept {
     if (blockingDepth++ > 0)
         return;
     std::uint64_t seen = state;
@@ -261,7 +265,7 @@ void ListenerPool::Worker::willBlock() {
         pool.addWorker();
 }
 
-void ListenerPool::Worker::didBlock() {
+void ListenerPool::Worker::didBlock() noexcept {
     if (--blockingDepth > 0)
         return;
     // In this phase nobody else changes the state.
@@ -297,7 +301,12 @@ bool ListenerPool::addWorkerLocked() {
 }
 
 bool ListenerPool::startThread() {
-    auto worker = std::make_unique<Worker>(*this);
+    std::unique_ptr<Worker> worker;
+    try {
+        worker = std::make_unique<Worker>(*this);
+    } catch (const std::bad_alloc&) {
+        return false;
+    }
     ++active_;
     Worker* raw = worker.get();
     if (!startThreadWithoutSignals(worker->thread, "listener", [this, raw] { work(*raw); })) {

@@ -50,7 +50,8 @@ struct ListenerScratch {
 class ListenerTask {
 public:
     virtual ~ListenerTask() = default;
-    /// The epoll events that came, or 0 after a requeue. The task arms its descriptor again when it is done.
+    /// The epoll events that came, or 0 after a requeue. The task arms its descriptor again when it is done. It throws
+    /// nothing: the thread serves others too.
     virtual void run(ListenerScratch& scratch, std::uint32_t events) = 0;
 };
 
@@ -71,7 +72,8 @@ public:
     [[nodiscard]] bool rearm(int fd, ListenerTask& task, std::uint32_t events);
     void remove(int fd);
 
-    /// Has the task called again, after others that are ready. From a task.
+    /// Has the task called again, after others that are ready. From a task. Throws std::bad_alloc, and does not have it
+    /// called then.
     void requeue(ListenerTask& task);
     /// Runs `job` on the watcher's thread after the delay. At most one is pending; a second call replaces it.
     void callLater(std::chrono::milliseconds delay, std::function<void()> job);
@@ -92,8 +94,8 @@ private:
 
     struct Worker final : BlockingObserver {
         explicit Worker(ListenerPool& owner) : pool(owner) {}
-        void willBlock() override;
-        void didBlock() override;
+        void willBlock() noexcept override;
+        void didBlock() noexcept override;
 
         ListenerPool& pool;
         std::thread thread;
@@ -122,6 +124,7 @@ private:
     /// Makes one more worker active, if fewer are than may run.
     void addWorker();
     bool addWorkerLocked() ZOR_REQUIRES(mutex_);
+    /// False when the system gives no thread, or no memory for one.
     bool startThread() ZOR_REQUIRES(mutex_);
     [[nodiscard]] bool canGrow() const ZOR_REQUIRES(mutex_);
     void joinEnded() ZOR_REQUIRES(mutex_);
