@@ -10,6 +10,7 @@
 #include "platform/linux/ListenerPool.h"
 #include "platform/linux/Names.h"
 #include "platform/linux/SeqpacketUpcallPort.h"
+#include "platform/linux/StatusSocket.h"
 #include "store/FewDescriptors.h"
 #include "support/RecordingLog.h"
 
@@ -99,7 +100,8 @@ TEST(WantOfDescriptors, TheRegistryHoldsWhatItHeld) {
                                world.test.path(Registered::path("a.plist")).c_str()),
                       0);
             EXPECT_EQ(who(*peer), "old") << left;
-            ::usleep(1'100'000); // after a second everything is looked at, notice or not
+            if (left == 0)
+                ::usleep(1'100'000); // after a second everything is looked at, notice or not
             EXPECT_EQ(who(*peer), "old") << left;
         }
         EXPECT_TRUE(eventually([&] { return who(*peer) == "new"; })) << left;
@@ -223,6 +225,27 @@ TEST(WantOfMemory, EndsOneConnection) {
     EXPECT_EQ(world.listener().counters().connectionsDropped, 4U);
     bystander.close();
     EXPECT_TRUE(world.isAtRest());
+}
+
+// Goal: a status for which there is no memory is a brief one, and costs the daemon nothing. Method: the full one
+// throws.
+TEST(WantOfMemory, TheStatusIsBrief) {
+    Registered world;
+    EpollRunLoop loop;
+    StatusSocket status(world.identity, loop, [](Peer&, StatusSocket::Detail detail) {
+        if (detail == StatusSocket::Detail::full)
+            throw std::bad_alloc();
+        return plist::Dictionary{{"Brief", true}};
+    });
+    ASSERT_EQ(status.open({.directory = world.test.root().runtimeDirectory(),
+                           .directoryPath = world.test.path(names::runtimeDirectory),
+                           .name = names::statusSocket}),
+              0);
+    RawClient client(world.test.path(std::string(names::runtimeDirectory) + "/" + names::statusSocket));
+    loop.post([&] { loop.stop(); });
+    loop.run();
+    const auto reply = client.receive();
+    EXPECT_TRUE(reply && reply->message.isTrue("Brief"));
 }
 
 // Goal: a handler that is about to wait while there is no memory for another thread waits all the same, and the thread

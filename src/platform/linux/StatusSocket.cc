@@ -6,6 +6,7 @@
 
 #include <cerrno>
 #include <ctime>
+#include <exception>
 #include <span>
 #include <sys/socket.h>
 #include <unistd.h>
@@ -87,9 +88,13 @@ void StatusSocket::answerAll() {
 }
 
 bool StatusSocket::makeFrame(Peer& peer, Detail detail) {
-    frame_.resize(ipc::frameHeaderBytes);
-    if (!plist::appendBinary(build_(peer, detail), frame_) || frame_.size() > frameBytesMax)
-        return false;
+    try {
+        frame_.resize(ipc::frameHeaderBytes);
+        if (!plist::appendBinary(build_(peer, detail), frame_) || frame_.size() > frameBytesMax)
+            return false;
+    } catch (const std::exception&) {
+        return false; // no memory for it; for the brief one there may be
+    }
     const ipc::FrameHeader header = {.payloadBytes = static_cast<std::uint32_t>(frame_.size() - ipc::frameHeaderBytes),
                                      .flags = ipc::frameIsReply,
                                      .id = 0};
