@@ -28,12 +28,12 @@
 #endif
 #endif
 
+#ifndef ZOR_OPERATOR_NEW_IS_TAKEN
+
 namespace {
 constexpr std::size_t everything = std::numeric_limits<std::size_t>::max();
 std::atomic<std::size_t> bytesRefusedFrom{everything};
 } // namespace
-
-#ifndef ZOR_OPERATOR_NEW_IS_TAKEN
 
 void* operator new(std::size_t size) {
     void* memory = size < bytesRefusedFrom.load(std::memory_order_relaxed) ? std::malloc(size) : nullptr;
