@@ -261,9 +261,12 @@ public:
                 const std::lock_guard lock(mutex_);
                 EXPECT_TRUE(inHandler_.insert(&connection).second) << "two events of one connection at once";
             }
+            const auto leave = [&](const void*) {
+                const std::lock_guard lock(mutex_);
+                inHandler_.erase(&connection);
+            };
+            const std::unique_ptr<const void, decltype(leave)> inside(&connection, leave);
             handle(connection, event);
-            const std::lock_guard lock(mutex_);
-            inHandler_.erase(&connection);
         })) << errno;
     }
     void stop() {

@@ -6,13 +6,11 @@
 #include "platform/PeerProcess.h"
 #include "platform/linux/EpollRunLoop.h"
 #include "platform/linux/FileDeviceLockState.h"
-#include "platform/linux/LinuxPeerIdentity.h"
 #include "platform/linux/ListenerPool.h"
 #include "platform/linux/Names.h"
 #include "platform/linux/SeqpacketUpcallPort.h"
 #include "platform/linux/StatusSocket.h"
 #include "store/FewDescriptors.h"
-#include "support/RecordingLog.h"
 
 #include <cstdlib>
 #include <functional>
@@ -55,49 +53,23 @@ void operator delete(void* memory, std::size_t) noexcept {
 namespace zor::platform {
 namespace {
 
-using test::ListenerWorld;
-using test::RawClient;
 using zor::test::FewDescriptors;
-
-/// A registry with one program, and whoever runs it.
-struct Registered {
-    Registered() {
-        copyProgram("/bin/sh", test.path("agent"));
-        test.replace(path("a.plist"), entryFor("old"));
-    }
-    [[nodiscard]] static std::string path(const std::string& name) {
-        return std::string(names::identityDirectory) + "/" + name;
-    }
-    [[nodiscard]] std::string entryFor(const std::string& identifier, const std::string& more = "") const {
-        return "<plist version=\"1.0\"><dict><key>Executable</key><string>" + test.path("agent") +
-               "</string><key>Identifier</key><string>" + identifier + "</string>" + more + "</dict></plist>";
-    }
-    TestRoot test;
-    support::RecordingLog log{5};
-    IdentityRegistry registry{test.root(), log, ::geteuid()};
-    LinuxPeerIdentity identity{registry, ::geteuid()};
-};
-
-std::string who(Peer& peer) {
-    const Identity identity = peer.identify(Peer::Explain::no);
-    return identity.grant ? identity.grant->identifier.value_or("") : "-";
-}
 
 // Goal: a registry that cannot be looked at holds what it held, and is looked at again. Method: a file changes while
 // there is no descriptor, or one, which the directory takes.
 TEST(WantOfDescriptors, TheRegistryHoldsWhatItHeld) {
     for (const rlim_t left : {0U, 1U}) {
-        Registered world;
-        const PeerServer server;
-        const PeerProcess process(server, world.test.path("agent"));
-        const auto peer = world.identity.peerOfSocket(process.socket());
+        PeerWorld world;
+        world.registerAs("a.plist", "agent", "old");
+        const PeerProcess process(world.server, world.program("agent"));
+        const auto peer = world.peerOf(process);
         ASSERT_TRUE(peer);
         EXPECT_EQ(who(*peer), "old");
-        world.test.replace(Registered::path("next"), world.entryFor("new"));
+        world.registerAs("next", "agent", "new");
         {
             const FewDescriptors few(left);
-            ASSERT_EQ(::rename(world.test.path(Registered::path("next")).c_str(),
-                               world.test.path(Registered::path("a.plist")).c_str()),
+            ASSERT_EQ(::rename(world.test.path(PeerWorld::pathOf("next")).c_str(),
+                               world.test.path(PeerWorld::pathOf("a.plist")).c_str()),
                       0);
             EXPECT_EQ(who(*peer), "old") << left;
             if (left == 0)
@@ -112,19 +84,18 @@ TEST(WantOfDescriptors, TheRegistryHoldsWhatItHeld) {
 // entry's condition cannot be looked up is granted nothing, not what a later entry grants. Method: a process is looked
 // at, and the kernel's agent accepted, with too few descriptors.
 TEST(WantOfDescriptors, APeerIsRefusedAndNotMistaken) {
-    Registered world;
-    const PeerServer server;
-    const PeerProcess process(server, world.test.path("agent"));
+    PeerWorld world;
+    world.registerAs("a.plist", "agent", "old");
+    const PeerProcess process(world.server, world.program("agent"));
     for (const rlim_t left : {0U, 1U}) {
         const FewDescriptors few(left);
-        EXPECT_FALSE(world.identity.peerOfSocket(process.socket()));
+        EXPECT_FALSE(world.peerOf(process));
         EXPECT_EQ(errno, EMFILE);
     }
-    EXPECT_EQ(who(*world.identity.peerOfSocket(process.socket())), "old");
-    world.test.replace(Registered::path("a-before.plist"),
-                       world.entryFor("first", "<key>Unit</key><string>none.service</string>"));
-    const auto peer = world.identity.peerOfSocket(process.socket());
-    EXPECT_EQ(who(*world.identity.peerOfSocket(process.socket())), "old");
+    EXPECT_EQ(who(*world.peerOf(process)), "old");
+    world.registerAs("a-before.plist", "agent", "first", "<key>Unit</key><string>none.service</string>");
+    const auto peer = world.peerOf(process);
+    EXPECT_EQ(who(*world.peerOf(process)), "old");
     {
         const FewDescriptors none(0);
         EXPECT_EQ(who(*peer), "-");
@@ -136,11 +107,8 @@ TEST(WantOfDescriptors, APeerIsRefusedAndNotMistaken) {
     ASSERT_EQ(port.checkIn(), 0);
     ASSERT_TRUE(port.serve(loop, [](const UpcallPacket&) { return std::vector<std::uint8_t>(); }));
     const FileDescriptor agent(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    const std::string path = world.test.path(std::string(names::runtimeDirectory) + "/" + names::upcallSocket);
-    std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
-    ASSERT_EQ(::connect(agent.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    ASSERT_TRUE(
+        connectTo(agent.get(), world.test.path(std::string(names::runtimeDirectory) + "/" + names::upcallSocket)));
     {
         const FewDescriptors few(1);
         loop.post([&] { loop.stop(); });
@@ -209,7 +177,7 @@ TEST(WantOfMemory, EndsOneConnection) {
         return true;
     };
     const auto requests = [](RawClient& client) {
-        plist::Data half = test::frameOf(3 * large, ipc::frameExpectsReply, 1, plist::Data(2 * large));
+        plist::Data half = frameOf(3 * large, ipc::frameExpectsReply, 1, plist::Data(2 * large));
         const NothingLarge limit(large);
         return client.send(half) && client.ended();
     };
@@ -222,7 +190,7 @@ TEST(WantOfMemory, EndsOneConnection) {
         EXPECT_TRUE(client.ended());
         EXPECT_TRUE(bystander.isServed());
     }
-    EXPECT_EQ(world.listener().counters().connectionsDropped, 4U);
+    EXPECT_EQ(world.counters().connectionsDropped, 4U);
     bystander.close();
     EXPECT_TRUE(world.isAtRest());
 }
@@ -230,7 +198,7 @@ TEST(WantOfMemory, EndsOneConnection) {
 // Goal: a status for which there is no memory is a brief one, and costs the daemon nothing. Method: the full one
 // throws.
 TEST(WantOfMemory, TheStatusIsBrief) {
-    Registered world;
+    PeerWorld world;
     EpollRunLoop loop;
     StatusSocket status(world.identity, loop, [](Peer&, StatusSocket::Detail detail) {
         if (detail == StatusSocket::Detail::full)
@@ -255,7 +223,7 @@ TEST(WantOfMemory, AThreadComesLater) {
     world.limits.threadsRunning = 1;
     std::promise<void> gate;
     world.start([opened = gate.get_future().share()](PeerConnection&, ServiceEvent& event) {
-        if (event.request == test::numbered(1)) {
+        if (event.request == numbered(1)) {
             std::optional<NothingLarge> limit(listenerScratchBytes);
             const BlockingScope blocking;
             limit.reset();
@@ -264,7 +232,7 @@ TEST(WantOfMemory, AThreadComesLater) {
         event.reply->send(event.request);
     });
     RawClient waits(world.socketPath());
-    ASSERT_TRUE(waits.send(test::numbered(1), 1));
+    ASSERT_TRUE(waits.send(numbered(1), 1));
     RawClient asks(world.socketPath());
     EXPECT_TRUE(asks.isServed());
     gate.set_value();
