@@ -410,22 +410,23 @@ TEST_F(Protection, AForbiddenOpenIsNoLock) {
     }
 }
 
-class QueueWithoutThread final : public platform::WorkQueue {
+class QueueWithoutMemory final : public platform::WorkQueue {
 public:
-    void async(std::function<void()>) override { throw std::system_error(EAGAIN, std::generic_category()); }
+    bool start() override { return true; }
+    void async(std::function<void()>) override { throw std::bad_alloc(); }
     void suspend() override {}
     void resume() override {}
 };
 
-// Goal: what is thrown around a pass ends the change with 40, as in one, and not the daemon. Method: a queue that gets
-// no thread for the retry, and a retry whose start finds no memory.
+// Goal: what is thrown around a pass ends the change with 40, as in one, and not the daemon. Method: a queue that has
+// no memory for the retry, and a retry whose start finds no memory.
 TEST_F(Protection, ExceptionsAroundAPass) {
     put("Documents/file", 4);
     lock();
     Request request = to(1);
     request.retryIfLocked = true;
-    QueueWithoutThread withoutThread;
-    platform::WorkQueue* const usual = std::exchange(world.lockStateQueue.inner, &withoutThread);
+    QueueWithoutMemory withoutMemory;
+    platform::WorkQueue* const usual = std::exchange(world.lockStateQueue.inner, &withoutMemory);
     EXPECT_EQ(change(request), 40U);
     world.lockStateQueue.inner = usual;
     EXPECT_EQ(world.services().platform().transactions.count(), 0U);
