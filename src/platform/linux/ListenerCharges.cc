@@ -39,9 +39,9 @@ ListenerCharges::Account* ListenerCharges::openConnection(uid_t uid, bool ownsRo
         if (found != accounts_.end() && found->second.connections >= limits_.connectionsMaxPerUser)
             return nullptr;
     }
-    Account& account = found != accounts_.end() ? found->second : accounts_[uid];
-    account.uid = uid;
-    account.ownsRoot = ownsRoot;
+    Account& account = found != accounts_.end()
+                           ? found->second
+                           : accounts_.try_emplace(uid, Account{.uid = uid, .ownsRoot = ownsRoot}).first->second;
     if (!ownsRoot)
         ++ofOthers_.connections;
     ++account.connections;

@@ -23,6 +23,7 @@ public:
 
     /// One user's share. Lives as long as the user has a connection.
     struct Account {
+        // Whoever holds a connection may read these two.
         uid_t uid = 0;
         bool ownsRoot = false;
         std::size_t connections = 0;
