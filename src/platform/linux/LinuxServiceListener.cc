@@ -54,6 +54,10 @@ private:
     void arm() { [[maybe_unused]] const bool armed = core_.pool.rearm(socket_, *this, EPOLLIN); }
 
     void admit(PeerSocket socket) {
+        // Who connected before the listening socket came to the daemon has not taken it over. What such a one has sent
+        // would come with descriptors in the place of credentials.
+        if (const int error = enableSenderCredentials(socket.get()); error != 0)
+            return core_.incidents.happened(ListenerIncident::unknownPeer, error);
         ucred credentials = {};
         socklen_t length = sizeof credentials;
         if (::getsockopt(socket.get(), SOL_SOCKET, SO_PEERCRED, &credentials, &length) != 0)
@@ -68,11 +72,10 @@ private:
             if (!account)
                 return core_.incidents.happened(ListenerIncident::tooManyConnections, credentials.uid);
             peer = identity_.peerOfSocket(socket.get());
-            // Who connected before the listening socket came to the daemon has not taken it over. What such a one has
-            // sent would come with descriptors in the place of credentials.
-            error = peer ? enableSenderCredentials(socket.get()) : errno;
-            if (error == 0)
+            if (peer)
                 connection = core_.unusedConnection();
+            else
+                error = errno;
         } catch (const std::bad_alloc&) {
             error = ENOMEM; // refused like one for which there is no descriptor
         }

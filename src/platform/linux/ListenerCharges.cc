@@ -41,7 +41,7 @@ ListenerCharges::Account* ListenerCharges::openConnection(uid_t uid, bool ownsRo
     }
     Account& account = found != accounts_.end()
                            ? found->second
-                           : accounts_.try_emplace(uid, Account{.uid = uid, .ownsRoot = ownsRoot}).first->second;
+                           : accounts_.emplace(uid, Account{.uid = uid, .ownsRoot = ownsRoot}).first->second;
     if (!ownsRoot)
         ++ofOthers_.connections;
     ++account.connections;

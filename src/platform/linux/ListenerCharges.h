@@ -23,9 +23,9 @@ public:
 
     /// One user's share. Lives as long as the user has a connection.
     struct Account {
-        // Whoever holds a connection may read these two.
-        uid_t uid = 0;
-        bool ownsRoot = false;
+        // These two may be read without the mutex.
+        const uid_t uid = 0;
+        const bool ownsRoot = false;
         std::size_t connections = 0;
         std::size_t inputBytes = 0;
         std::size_t outputBytes = 0;
