@@ -10,7 +10,7 @@
 #include "platform/linux/Names.h"
 #include "platform/linux/SeqpacketUpcallPort.h"
 #include "platform/linux/StatusSocket.h"
-#include "store/FewDescriptors.h"
+#include "support/FewDescriptors.h"
 
 #include <cstdlib>
 #include <functional>
@@ -53,8 +53,6 @@ void operator delete(void* memory, std::size_t) noexcept {
 namespace zor::platform {
 namespace {
 
-using zor::test::FewDescriptors;
-
 // Goal: a registry that cannot be looked at holds what it held, and is looked at again. Method: a file changes while
 // there is no descriptor, or one, which the directory takes.
 TEST(WantOfDescriptors, TheRegistryHoldsWhatItHeld) {
@@ -67,7 +65,7 @@ TEST(WantOfDescriptors, TheRegistryHoldsWhatItHeld) {
         EXPECT_EQ(who(*peer), "old");
         world.registerAs("next", "agent", "new");
         {
-            const FewDescriptors few(left);
+            const support::FewDescriptors few(left);
             ASSERT_EQ(::rename(world.test.path(PeerWorld::pathOf("next")).c_str(),
                                world.test.path(PeerWorld::pathOf("a.plist")).c_str()),
                       0);
@@ -88,7 +86,7 @@ TEST(WantOfDescriptors, APeerIsRefusedAndNotMistaken) {
     world.registerAs("a.plist", "agent", "old");
     const PeerProcess process(world.server, world.program("agent"));
     for (const rlim_t left : {0U, 1U}) {
-        const FewDescriptors few(left);
+        const support::FewDescriptors few(left);
         EXPECT_FALSE(world.peerOf(process));
         EXPECT_EQ(errno, EMFILE);
     }
@@ -97,7 +95,7 @@ TEST(WantOfDescriptors, APeerIsRefusedAndNotMistaken) {
     const auto peer = world.peerOf(process);
     EXPECT_EQ(who(*world.peerOf(process)), "old");
     {
-        const FewDescriptors none(0);
+        const support::FewDescriptors none(0);
         EXPECT_EQ(who(*peer), "-");
     }
     EXPECT_EQ(who(*peer), "old");
@@ -110,7 +108,7 @@ TEST(WantOfDescriptors, APeerIsRefusedAndNotMistaken) {
     ASSERT_TRUE(
         connectTo(agent.get(), world.test.path(std::string(names::runtimeDirectory) + "/" + names::upcallSocket)));
     {
-        const FewDescriptors few(1);
+        const support::FewDescriptors few(1);
         loop.post([&] { loop.stop(); });
         loop.run();
     }
@@ -131,7 +129,7 @@ TEST(WantOfDescriptors, AnUnlockIsSeenAfterwards) {
     ASSERT_EQ(state.registerForChanges(loop, [&] { seen = state.currentState(); }), 0);
     std::thread runner([&] { loop.run(); });
     {
-        const FewDescriptors none(0);
+        const support::FewDescriptors none(0);
         EXPECT_EQ(::rename(test.path(directory + "next").c_str(), test.path(directory + names::lockState).c_str()), 0);
         EXPECT_TRUE(eventually([&] { return seen == FileDeviceLockState::unknown; }));
     }

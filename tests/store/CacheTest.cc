@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // The container cache: built once, in the directory's order, by one thread or two; what it answers when the disk is not
 // as it remembers; readers and writers at once.
-#include "store/FewDescriptors.h"
+#include "support/FewDescriptors.h"
 #include "world/World.h"
 
 #include <gtest/gtest.h>
@@ -228,7 +228,7 @@ TEST_F(Cache, AShortageOfDescriptorsIsNoAbsence) {
     put(applications, 1, "a", 11);
     ASSERT_EQ(all().size(), 1U);
     const std::string identifier = "a";
-    const FewDescriptors few(0);
+    const support::FewDescriptors few(0);
     EXPECT_FALSE(cache().allContainersForUser(mobile, application, false));
     EXPECT_FALSE(cache().containerForUser(mobile, application, &identifier, std::string_view(uuidNumber(11))));
 }

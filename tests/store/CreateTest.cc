@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Creating, finding and listing containers: what a container of each class looks like on disk, what is refused, what a
 // failing disk leaves, and many clients at once.
-#include "store/FewDescriptors.h"
+#include "support/FewDescriptors.h"
 #include "world/World.h"
 
 #include <array>
@@ -196,7 +196,7 @@ TEST_F(Create, AShortageOfDescriptorsHidesNoContainer) {
         SCOPED_TRACE(left);
         world.restart();
         {
-            const FewDescriptors few(left);
+            const support::FewDescriptors few(left);
             const auto found = world.create(identifier);
             refused = refused || !found;
             EXPECT_TRUE(!found || found->uuid == made.uuid);
@@ -204,7 +204,7 @@ TEST_F(Create, AShortageOfDescriptorsHidesNoContainer) {
         for (int i = 0; i < 2; ++i)
             EXPECT_EQ(world.make(identifier).uuid, made.uuid);
         {
-            const FewDescriptors few(left);
+            const support::FewDescriptors few(left);
             (void)world.daemonsClient().deleteContainerForUser(mobile, &identifier, application, false);
         }
         EXPECT_TRUE(!isThere(made.path) || support::readTree(made.path).describe() == before);

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Replace and wipe: what is swapped, what is refused, what each failing step leaves, and what a launch makes of each
 // state that a stop can leave.
-#include "store/FewDescriptors.h"
+#include "support/FewDescriptors.h"
 #include "world/World.h"
 
 #include <algorithm>
@@ -232,7 +232,7 @@ TEST_F(Replace, WantOfDescriptorsNeitherLosesNorBringsBack) {
             const auto old = make(identifier, false);
             const auto fresh = make(identifier, asTransient);
             const auto replaced = [&] {
-                const FewDescriptors few(left);
+                const support::FewDescriptors few(left);
                 return replace(swap(&old, fresh, preserve));
             }();
             refused += !replaced;

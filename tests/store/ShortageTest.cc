@@ -2,8 +2,8 @@
 // What the daemon could not look at, for want of descriptors or because the disk refused: it deletes nothing for that,
 // and keeps no answer that came of it.
 #include "entitlements/ZOREntitlementMapping.h"
-#include "store/FewDescriptors.h"
 #include "store/operations/ReplaceJournal.h"
+#include "support/FewDescriptors.h"
 #include "world/World.h"
 
 #include <filesystem>
@@ -60,7 +60,7 @@ TEST_F(Shortage, JournalsThatCannotBeReadKeepWhatTheyName) {
         } else {
             world.restart();
             world.load();
-            const FewDescriptors few(left);
+            const support::FewDescriptors few(left);
             world.daemonsClient().containerManagerSetup();
         }
         relaunch();
@@ -81,7 +81,7 @@ TEST_F(Shortage, ASizeMeasuredInPartIsNotKept) {
                                                             .containerClass = ContainerClass::bundleApplication};
         std::uint64_t measured = 0;
         {
-            const FewDescriptors few(left);
+            const support::FewDescriptors few(left);
             measured = world.daemonsClient().diskUsageForUserId(address).bytes;
         }
         const auto whole = world.daemonsClient().diskUsageForUserId(address);

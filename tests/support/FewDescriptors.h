@@ -6,7 +6,7 @@
 #include <sys/resource.h>
 #include <unistd.h>
 
-namespace zor::test {
+namespace zor::support {
 
 /// Takes all descriptors of this process but some.
 class FewDescriptors {
@@ -26,4 +26,4 @@ private:
     rlimit before_{};
 };
 
-} // namespace zor::test
+} // namespace zor::support
