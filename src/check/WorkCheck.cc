@@ -84,7 +84,7 @@ void WorkCheck::checkJournals() {
 void WorkCheck::addJournal(const FileURL& url) {
     ZORFileManager& fileManager = look_.device().fileManager();
     auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(look_.device().log(), fileManager, url);
-    std::string what = "is no journal that can be read; it will be discarded";
+    std::string what = "is no journal that can be read; it will be discarded, unless the disk cannot read it";
     if (journal) {
         journal->moveToRoot(look_.device().root().canonicalPath(), look_.device().places().stagingDirectory());
         if (fileManager.itemExistsAtURL(journal->destUrl))

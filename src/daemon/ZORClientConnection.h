@@ -231,7 +231,8 @@ private:
     std::optional<ZORError> cleanUpReplace(const ReplaceProgress& progress, StartDeletionThread startDeletionThread);
     Result<void> openDirectories(ReplaceProgress& progress, const FileURL& stagingUrl);
     ZORError notInPlace(const ReplaceProgress& progress, const ZORError& cause);
-    Result<void> recoverReplace(const FileURL& journalUrl);
+    /// `journal` is nullptr for a file that is none.
+    Result<void> recoverReplace(const FileURL& journalUrl, ReplaceJournal* journal);
     Result<void> applyReplaceJournal(const ReplaceJournal& journal);
 
     Result<std::shared_ptr<ZORMetadata>> knownContainer(const char* function, const ContainerAddress& address);

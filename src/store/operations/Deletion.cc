@@ -56,9 +56,16 @@ Result<void> ZORClientConnection::stageForDeleteContainersWithUsers(const Deleti
             std::optional<AllIdentifiersLock> lock;
             if (useLocking == UseLocking::yes)
                 lock.emplace(services_.locks, LockMode::writing);
-            for (std::size_t index = 0; index < count; ++index)
-                TRY(stageForDelete(batch, index, changed));
-            return {};
+            Result<void> first;
+            for (std::size_t index = 0; index < count; ++index) {
+                auto one = stageForDelete(batch, index, changed);
+                // What could not be looked for keeps no other from going.
+                if (!one && !one.error().isOwnShortage())
+                    return one;
+                if (!one && first)
+                    first = std::move(one);
+            }
+            return first;
         }();
         // Those staged before a failure are gone for good too.
         const auto failed = syncDirectories(std::move(changed));
@@ -114,19 +121,17 @@ bool ZORClientConnection::takeAwayForDelete(const FileURL& container, std::vecto
         changed.push_back(deathRow);
         return true;
     }
-    if (!moved)
-        ZOR_LOG(services_.log, logLevelDebug, "Couldn't stage for deletion from %s to %s: %s", container.c_str(),
-                destination.c_str(), moved.error().text().c_str());
+    ZOR_LOG(services_.log, logLevelDebug, "Couldn't stage for deletion from %s to %s: %s", container.c_str(),
+            destination.c_str(), moved.error().text().c_str());
     // An earlier container of a well-known name may still wait on death row under that name. This one goes beside it: a
     // stop while it is removed in place would leave half of it under the name it has.
-    const bool nameIsTaken = !moved && (moved.error().isPosix(ENOTEMPTY) || moved.error().isPosix(EEXIST));
+    const bool nameIsTaken = (moved.error().isPosix(ENOTEMPTY) || moved.error().isPosix(EEXIST));
     if (nameIsTaken && _moveItemAtURLToDeathRow(container, StartDeletionThread::no)) {
         changed.push_back(deathRow);
         return true;
     }
     // What stopped the move would stop the removal too, half-way: then it stays whole.
-    const auto removed =
-        !moved && moved.error().isOwnShortage() ? moved : services_.fileManager.removeItemAtURL(container);
+    const auto removed = moved.error().isOwnShortage() ? moved : services_.fileManager.removeItemAtURL(container);
     if (!removed) {
         makeError(services_.log, {stageFunction, __LINE__}, ErrorCode::listForDeletionFailed, &removed.error(),
                   LogFlag::yes, "Failed to delete container at %s: %s", container.c_str(),

@@ -191,9 +191,9 @@ Result<void> ZORClientConnection::refuseSecondOfIdentifier(const ReplaceProgress
         return {};
     const auto live = services_.cache.containerForUser(record.uid(), record.containerClass(), &record.identifier(),
                                                        progress.oldWasTransient);
-    if (!live && !live.error().is(ErrorCode::notFound))
+    if (!live && !live.error().is(ErrorCode::notFound) && (!progress.oldRecord || live.error().isOwnShortage()))
         return live.error();
-    // With an old one, the one that is found may be the new one itself.
+    // With an old one, the one that is found may be the new one itself; one that has lost its files is none.
     if (!live || (progress.oldRecord && *live == progress.newRecord))
         return {};
     return makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::alreadyExists, nullptr, LogFlag::yes,

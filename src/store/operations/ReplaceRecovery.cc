@@ -14,6 +14,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <iterator>
+#include <optional>
 
 namespace zor {
 
@@ -71,7 +72,8 @@ Found look(ZORFileManager& fileManager, const FileURL& url) {
 
 /// A journal that could not be read may be a good one: it waits for a launch that can read it.
 bool saysNothingOfContent(const ZORError& readFailure) {
-    return readFailure.isOwnShortage() || readFailure.isPosix(EIO);
+    const ZORError* const cause = readFailure.underlying();
+    return cause && (cause->isOwnShortage() || cause->isPosix(EIO));
 }
 
 /// nullptr when what matters cannot be examined.
@@ -99,23 +101,27 @@ Result<void> ZORClientConnection::_recoverFromReplaceOperationsWithError() {
     // A journal has its name for itself alone, so no later write removes what a stop left of this one's.
     for (const FileURL& leftover : services_.fileManager.writeLeftoversInDirectoryAtURL(replace))
         (void)_moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
-    for (const FileURL& item : *items)
-        TRY(recoverReplace(item));
-    return {};
+    std::optional<ZORError> unread;
+    for (const FileURL& item : *items) {
+        auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(services_.log, services_.fileManager, item);
+        // It stays, with what it names in staging; the others do not hang on it.
+        if (!journal && saysNothingOfContent(journal.error()))
+            unread = std::move(journal).error();
+        else
+            TRY(recoverReplace(item, journal ? &*journal : nullptr));
+    }
+    return unread ? Result<void>(std::move(*unread)) : Result<void>();
 }
 
-Result<void> ZORClientConnection::recoverReplace(const FileURL& journalUrl) {
+Result<void> ZORClientConnection::recoverReplace(const FileURL& journalUrl, ReplaceJournal* journal) {
     const Log& log = services_.log;
-    ZORFileManager& fileManager = services_.fileManager;
-    auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(log, fileManager, journalUrl);
     if (journal) {
-        journal->moveToRoot(fileManager.resolver().root().canonicalPath(), services_.configuration.stagingDirectory());
+        journal->moveToRoot(services_.fileManager.resolver().root().canonicalPath(),
+                            services_.configuration.stagingDirectory());
         if (log.writes(logLevelDebug))
             log.write(logLevelDebug, recoverFunction, "Doing a replace of %s with info: %s", journalUrl.c_str(),
                       journal->text().c_str());
         TRY(applyReplaceJournal(*journal));
-    } else if (const ZORError* cause = journal.error().underlying(); cause && saysNothingOfContent(*cause)) {
-        return journal.error();
     }
     if (const auto moved = _moveItemAtURLToDeathRow(journalUrl, StartDeletionThread::no); !moved)
         return makeError(log, {recoverFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
