@@ -136,7 +136,8 @@ private:
                                   const DirectoryAttributes& attributes);
     Result<void> applyAttributes(int parent, const std::string& name, const std::string& path,
                                  const DirectoryAttributes& attributes);
-    void standardizeEntry(int parent, const char* name, const std::string& path, uid_t uid, gid_t gid,
+    /// `directory` is the entry's own descriptor where it is a directory that is open, else negative.
+    void standardizeEntry(int parent, const char* name, int directory, const std::string& path, uid_t uid, gid_t gid,
                           fs::NamesMet& namesMet);
 
     const Log& log_;

@@ -225,28 +225,37 @@ Result<void> ZORFileManager::_traverseDirectory(const FileURL& url,
     return {};
 }
 
-void ZORFileManager::standardizeEntry(int parent, const char* name, const std::string& path, uid_t uid, gid_t gid,
-                                      fs::NamesMet& namesMet) {
-    constexpr const char* function = "standardizeOwnershipAtURL";
-    const auto item = platform::openBeneath(parent, name, O_PATH | O_NOFOLLOW);
-    struct stat status{};
-    if (!item || ::fstat(item->get(), &status) != 0) {
-        const int number = item ? errno : item.error();
-        if (number != ENOENT)
-            log_.write(logLevelError, function, "Could not chown %s: %s", ZOR_SHOWN(path), errorText(number));
-        return;
+void ZORFileManager::standardizeEntry(int parent, const char* name, int directory, const std::string& path, uid_t uid,
+                                      gid_t gid, fs::NamesMet& namesMet) {
+    const auto failed = [&](const char* what, int number) {
+        log_.write(logLevelError, "standardizeOwnershipAtURL", "Could not %s %s: %s", what, ZOR_SHOWN(path),
+                   errorText(number));
+    };
+    platform::FileDescriptor opened;
+    if (directory < 0) {
+        auto item = platform::openBeneath(parent, name, O_PATH | O_NOFOLLOW);
+        if (!item && item.error() != ENOENT)
+            failed("chown", item.error());
+        if (!item)
+            return;
+        opened = std::move(*item);
     }
+    // A directory that is walked is given away itself, whatever has its name by now: then nobody moves names in it.
+    const int item = directory < 0 ? opened.get() : directory;
+    struct stat status{};
+    if (::fstat(item, &status) != 0)
+        return failed("chown", errno);
     // A file with another name elsewhere may belong to somebody else's tree. A name counts once its directory has been
     // given away: before, the former owner could move it on and have it counted again.
     const bool sharedElsewhere =
         !S_ISDIR(status.st_mode) && status.st_nlink > 1 && !(namesAreOf(uid, parent) && namesMet.wasLast(status));
     if (!sharedElsewhere && (status.st_uid != uid || status.st_gid != gid))
-        if (const int changed = disk_.changeOwner(item->get(), uid, gid); changed < 0)
-            log_.write(logLevelError, function, "Could not chown %s: %s", ZOR_SHOWN(path), errorText(-changed));
+        if (const int changed = disk_.changeOwner(item, uid, gid); changed < 0)
+            failed("chown", -changed);
     if (sharedElsewhere || S_ISLNK(status.st_mode)) // Linux keeps no mode for a link
         return;
-    if (const int changed = disk_.changeMode(item->get(), standardMode(status.st_mode)); changed < 0)
-        log_.write(logLevelError, function, "Could not chmod %s: %s", ZOR_SHOWN(path), errorText(-changed));
+    if (const int changed = disk_.changeMode(item, standardMode(status.st_mode)); changed < 0)
+        failed("chmod", -changed);
 }
 
 Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid) {
@@ -256,7 +265,7 @@ Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t
         const std::string path = below(url, entry.path());
         if (entry.kind != WalkEntryKind::directoryEnd && !entry.onOtherFileSystem &&
             path.find(names::metadataFile) == std::string::npos)
-            standardizeEntry(entry.parent, entry.name, path, uid, gid, namesMet);
+            standardizeEntry(entry.parent, entry.name, entry.directory, path, uid, gid, namesMet);
         return {};
     });
     const auto parent = resolver_.openParent(url);
@@ -266,7 +275,7 @@ Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t
         return posixError(ZOR_HERE, failure, "Could not stat %s: %s", url.c_str(), errorText(failure));
     fs::NamesMet again; // the root's name has been counted
     if (!rootIsMetadata)
-        standardizeEntry(parent->directory.get(), parent->name.c_str(), url.path(), uid, gid, again);
+        standardizeEntry(parent->directory.get(), parent->name.c_str(), -1, url.path(), uid, gid, again);
     return walked;
 }
 
