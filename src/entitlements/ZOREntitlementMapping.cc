@@ -44,12 +44,14 @@ plist::Dictionary ZOREntitlementMapping::_readEntitlementMappingFromDisk() {
 Result<void> ZOREntitlementMapping::moveUnreadableFileAside() {
     fileIsUnread_ = true;
     // An earlier loss that nobody has looked at is not written over.
-    if (!fileManager_.itemDoesNotExistAtURL(unreadableFileUrl_)) {
+    if (fileManager_.itemExistsAtURL(unreadableFileUrl_)) {
         log_.write(logLevelError, __func__,
                    "%s lies there already; the unreadable file is left where it is, until the map is saved",
                    unreadableFileUrl_.c_str());
         return {};
     }
+    if (!fileManager_.itemDoesNotExistAtURL(unreadableFileUrl_))
+        return posixError(ZOR_HERE, EIO, "%s cannot be examined", unreadableFileUrl_.c_str());
     TRY(fileManager_.moveItemAtURL(entitlementMappingFileUrl_, unreadableFileUrl_));
     fileIsUnread_ = false;
     log_.write(logLevelError, __func__,
