@@ -16,7 +16,9 @@ class Daemon {
 public:
     struct Options {
         int logLevel = logLevelNotice;
-        /// Runs when clients can connect, before the run loop: tells the service manager, opens the status.
+        /// Runs when all is set up, before the first client can connect: opens what else is served.
+        std::function<void()> setUp;
+        /// Runs when clients can connect, before the run loop: tells the service manager.
         std::function<void()> ready;
     };
     Daemon(Composition& composition, Options options) : composition_(composition), options_(std::move(options)) {}
@@ -35,7 +37,8 @@ public:
 private:
     bool startQueues();
     bool startUpcallServer();
-    /// Without it the daemon serves the upcall alone, and nobody is told that it is ready.
+    /// Without it the daemon serves the upcall alone, and nobody is told that it is ready: a service manager starts it
+    /// again when that has taken too long.
     bool startListener();
 
     Composition& composition_;

@@ -108,8 +108,10 @@ int main(int argumentCount, char** arguments) {
         std::fputs(options.error().text.c_str(), options.error().exitStatus == 0 ? stdout : stderr);
         return options.error().exitStatus;
     }
-    if (!prepareProcess())
+    if (!prepareProcess()) {
+        std::fputs("zorvaned: standard input, output or error is closed, and there is no /dev/null for it\n", stderr);
         return 1;
+    }
 
     using platform::RotatingLog;
     auto platform = platform::LinuxPlatform::open({
@@ -132,10 +134,9 @@ int main(int argumentCount, char** arguments) {
     platform::StatusSocket statusSocket(
         (*platform)->peers(), (*platform)->runLoop(),
         [&](platform::Peer& peer, platform::StatusSocket::Detail detail) { return status.forPeer(peer, detail); });
-    Daemon daemon(composition, {.logLevel = options->logLevel, .ready = [&] {
-                                    openStatus(**platform, statusSocket, composition.log());
-                                    (void)notify.send("READY=1");
-                                }});
+    Daemon daemon(composition, {.logLevel = options->logLevel,
+                                .setUp = [&] { openStatus(**platform, statusSocket, composition.log()); },
+                                .ready = [&] { (void)notify.send("READY=1"); }});
     const int exitStatus = daemon.run();
     (void)notify.send("STOPPING=1");
     statusSocket.close();

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/base/ZORError.h"
 
+#include <bit>
 #include <cerrno>
 #include <cstring>
 
@@ -16,7 +17,8 @@ bool ZORError::isOwnShortage() const {
 }
 
 ErrorCode ZORError::replyCode() const {
-    return static_cast<ErrorCode>(static_cast<std::int64_t>(isPosix(EPERM) ? EACCES : code_));
+    // A POSIX number is none of the enumerators: it is carried, not converted.
+    return std::bit_cast<ErrorCode>(static_cast<std::int64_t>(isPosix(EPERM) ? EACCES : code_));
 }
 
 void logError(const Log& log, const ZORError& error) {

@@ -53,7 +53,7 @@ public:
     LinuxServiceListener(PeerIdentity& identity, ListenerOptions options);
     ~LinuxServiceListener() override;
 
-    /// Once. errno tells why when it is false; nobody can connect then.
+    /// Once. errno tells why when it is false; nobody can connect to a socket of its own then.
     bool resume(ServiceHandler handler) override;
     /// Each connection that is still open gets its invalid event from the calling thread. Replies that come later go
     /// nowhere.

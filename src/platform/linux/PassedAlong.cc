@@ -14,7 +14,8 @@ namespace {
 // Who does not handle it ignores it, so a stray one does no harm.
 constexpr int interruptSignal = SIGURG;
 
-/// No honest close takes this long.
+/// No honest close takes this long; an early interrupt does no harm. The later ones are for what is waited for next.
+constexpr timespec firstInterrupt = {.tv_sec = 0, .tv_nsec = 1'000'000};
 constexpr timespec interruptEvery = {.tv_sec = 0, .tv_nsec = 10'000'000};
 
 // Older headers do not have it.
@@ -49,14 +50,15 @@ public:
     InterruptTimer(const InterruptTimer&) = delete;
     InterruptTimer& operator=(const InterruptTimer&) = delete;
 
-    /// Zero stops it.
-    void repeatEvery(const timespec& time) const {
-        const itimerspec setting = {.it_interval = time, .it_value = time};
-        if (made_)
-            ::timer_settime(timer_, 0, &setting, nullptr);
-    }
+    void begin() const { set({.it_interval = interruptEvery, .it_value = firstInterrupt}); }
+    void stop() const { set({}); }
 
 private:
+    void set(const itimerspec& times) const {
+        if (made_)
+            ::timer_settime(timer_, 0, &times, nullptr);
+    }
+
     timer_t timer_ = nullptr;
     bool made_ = false;
 };
@@ -87,11 +89,11 @@ void interruptThread(pid_t threadId) {
 }
 
 InterruptedScope::InterruptedScope() {
-    timerOfThisThread().repeatEvery(interruptEvery);
+    timerOfThisThread().begin();
 }
 
 InterruptedScope::~InterruptedScope() {
-    timerOfThisThread().repeatEvery({});
+    timerOfThisThread().stop();
 }
 
 void PeerSocket::reset() noexcept {

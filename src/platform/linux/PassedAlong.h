@@ -8,7 +8,8 @@
 // ends the wait: the call then returns what it would have returned at once.
 //
 // Receiving for clients is the hot path: it leaves a mark, and the pool's watcher interrupts whoever stays when no
-// other thread waits for work. All other calls that may close something of a peer's are made in an InterruptedScope.
+// other thread waits for work. All other calls on sockets in use that may close something of a peer's are made in an
+// InterruptedScope.
 #pragma once
 
 #include "platform/FileDescriptor.h"
