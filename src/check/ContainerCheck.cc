@@ -1,10 +1,12 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "check/ContainerCheck.h"
 
+#include "check/ShellText.h"
 #include "daemon/base/UserIdentity.h"
 #include "fs/AtomicFile.h"
 #include "fs/LeftoverNames.h"
 #include "ipc/Keys.h"
+#include "platform/linux/Names.h"
 #include "platform/linux/Openat2.h"
 #include "store/Names.h"
 #include "store/ZORGlobalConfiguration.h"
@@ -70,6 +72,7 @@ std::string chownCommand(const FileURL& url, mode_t mode, std::uint32_t owner, b
 } // namespace
 
 void ContainerCheck::checkAll() {
+    checkWellKnownTable();
     checkPlacesOfMoves();
     for (std::uint64_t number = 1; ipc::isContainerClass(number); ++number) {
         const ContainerClass containerClass = classes(number);
@@ -83,6 +86,15 @@ void ContainerCheck::checkAll() {
     }
 }
 
+void ContainerCheck::checkWellKnownTable() {
+    const ZORWhitelist& table = look_.whitelist();
+    if (table.isWhole(ContainerClass::dataSystem) && table.isWhole(ContainerClass::sharedSystemGroup))
+        return;
+    const FileURL url = FileURL::file(look_.device().root().path(platform::names::wellKnownTable));
+    look_.addForPerson(FindingCode::unexamined, url, "cannot be read whole, so no boot judges names by it",
+                       "ls -ld " + shellQuoted(url.path()));
+}
+
 void ContainerCheck::checkPlacesOfMoves() {
     const StorePlaces& places = look_.device().places();
     std::vector<FileURL> parents = {places.formerBundleDirectory().deletingLastPathComponent(),
@@ -91,9 +103,15 @@ void ContainerCheck::checkPlacesOfMoves() {
                                     places.transientBundleDirectory().deletingLastPathComponent()};
     for (const MobileUser& user : look_.users())
         parents.push_back(StorePlaces::userTransientDirectory(user.home).deletingLastPathComponent());
-    for (const FileURL& parent : parents)
-        if (const auto directory = look_.openDirectory(parent))
+    for (const FileURL& parent : parents) {
+        // What holds the old location may lie behind a link of the administrator's; where the others do, their classes
+        // say so.
+        const auto directory = look_.device().fileManager().resolver().openDirectory(parent);
+        if (directory)
             look_.forEachName(directory->get(), parent, [&](const char* name) { checkHidden(parent, name); });
+        else if (directory.error() != ENOENT && directory.error() != ELOOP && directory.error() != ENOTDIR)
+            look_.addUnexamined(parent, directory.error());
+    }
 }
 
 void ContainerCheck::checkClass(ContainerClass containerClass, std::uint32_t user, const std::optional<FileURL>& home) {
@@ -194,8 +212,12 @@ std::shared_ptr<ZORMetadata> ContainerCheck::readRecord(const ClassDirectory& di
     if (::fstatat(container, names::metadataFile, &status, AT_SYMLINK_NOFOLLOW) != 0 && errno == ENOENT) {
         // One that has gone altogether was read a moment too late.
         if (::fstatat(directory.descriptor, name, &status, AT_SYMLINK_NOFOLLOW) == 0) {
-            Finding& finding = look_.add(FindingCode::metadataMissing, directory.url.appendingDirectory(name),
-                                         "has no metadata file", Mender::boot);
+            const FileURL url = directory.url.appendingDirectory(name);
+            constexpr const char* what = "has no metadata file";
+            Finding& finding =
+                look_.whitelist().judgeName(name, directory.containerClass) == ZORWhitelist::NameOf::unknown
+                    ? look_.addForPerson(FindingCode::metadataMissing, url, what, look_.moveAside(url))
+                    : look_.add(FindingCode::metadataMissing, url, what, Mender::boot);
             finding.containerClass = directory.containerClass;
             finding.user = directory.user;
         }

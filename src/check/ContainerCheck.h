@@ -35,6 +35,7 @@ private:
         std::shared_ptr<ZORMetadata> record;
     };
 
+    void checkWellKnownTable();
     /// Outside of class directories: what holds the directories that a boot moves.
     void checkPlacesOfMoves();
     void checkClass(ContainerClass containerClass, std::uint32_t user, const std::optional<FileURL>& home);

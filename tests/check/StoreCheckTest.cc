@@ -211,6 +211,8 @@ const std::vector<Damage>& damages() {
                  << "third:x:504:504::/private/var/" + std::string(300, 'n') + ":/bin/sh\n";
          },
          unexamined, person, "nnn"},
+        {"half a table of names", [](S s) { s.world.write("etc/zorvane/wellknown.plist", "x"); }, unexamined, person,
+         "wellknown.plist"},
         {"somebody's boot marker", [](S s) { s.world.bootMarker.state = {.present = false, .foreign = true}; },
          bootMarkerForeign, launch, "sem.marker"},
     };
