@@ -35,7 +35,8 @@ zorvane::Result<RegisteredEntitlements> RegisteredEntitlements::ask(const zorvan
     };
     auto* map = std::get_if<zorvane::Map>(&status->content);
     if (map && in<bool>(map, statusEntitlementsLeftOut))
-        return failed("the registered entitlements are too many for the status socket");
+        return failed("the registered entitlements are too many or nest too deep for the status socket, or the daemon "
+                      "has too little memory");
     if (!in<zorvane::Map>(map, statusEntitlements))
         return failed("only the owner of the daemon's root may see registered entitlements");
     return RegisteredEntitlements(std::move(*map));

@@ -183,7 +183,8 @@ private:
 
 /// Whom the daemon takes this program for, and why ("Peer"); for the owner of the root also how it is doing
 /// ("Counters"), what is registered ("Entitlements") and who refers to which group ("GroupReferences"). The last two
-/// are missing when they are too long for the socket; "EntitlementsLeftOut" is then true.
+/// are missing when they are too long for the socket or nest too deep, or the daemon lacks the memory for them;
+/// "EntitlementsLeftOut" is then true.
 [[nodiscard]] Result<Value> status(const ConnectOptions& options);
 
 } // namespace zorvane

@@ -37,6 +37,12 @@ constexpr bool limitsMemory = true;
 constexpr __u32 architecture = AUDIT_ARCH_X86_64;
 #elif defined(__aarch64__)
 constexpr __u32 architecture = AUDIT_ARCH_AARCH64;
+#elif defined(__riscv) && __riscv_xlen == 64
+constexpr __u32 architecture = AUDIT_ARCH_RISCV64;
+#elif defined(__s390x__)
+constexpr __u32 architecture = AUDIT_ARCH_S390X;
+#elif defined(__powerpc64__) && defined(__LITTLE_ENDIAN__)
+constexpr __u32 architecture = AUDIT_ARCH_PPC64LE;
 #else
 #error "name this architecture: without it the kernel cannot tell whose calls are counted how"
 #endif
