@@ -51,7 +51,7 @@ Result<void> ZOREntitlementMapping::moveUnreadableFileAside() {
         return {};
     }
     if (!fileManager_.itemDoesNotExistAtURL(unreadableFileUrl_))
-        return posixError(ZOR_HERE, EIO, "%s cannot be examined", unreadableFileUrl_.c_str());
+        return posixError(ZOR_HERE, EIO, "stat of %s failed: %s", unreadableFileUrl_.c_str(), errorText(EIO));
     TRY(fileManager_.moveItemAtURL(entitlementMappingFileUrl_, unreadableFileUrl_));
     fileIsUnread_ = false;
     log_.write(logLevelError, __func__,

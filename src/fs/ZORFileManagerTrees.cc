@@ -227,15 +227,15 @@ Result<void> ZORFileManager::_traverseDirectory(const FileURL& url,
 
 void ZORFileManager::standardizeEntry(int parent, const char* name, int directory, const std::string& path, uid_t uid,
                                       gid_t gid, fs::NamesMet& namesMet) {
-    const auto failed = [&](const char* what, int number) {
-        log_.write(logLevelError, "standardizeOwnershipAtURL", "Could not %s %s: %s", what, ZOR_SHOWN(path),
-                   errorText(number));
+    constexpr const char* function = "standardizeOwnershipAtURL";
+    const auto notGiven = [&](int number) {
+        log_.write(logLevelError, function, "Could not chown %s: %s", ZOR_SHOWN(path), errorText(number));
     };
     platform::FileDescriptor opened;
     if (directory < 0) {
         auto item = platform::openBeneath(parent, name, O_PATH | O_NOFOLLOW);
         if (!item && item.error() != ENOENT)
-            failed("chown", item.error());
+            notGiven(item.error());
         if (!item)
             return;
         opened = std::move(*item);
@@ -244,18 +244,18 @@ void ZORFileManager::standardizeEntry(int parent, const char* name, int director
     const int item = directory < 0 ? opened.get() : directory;
     struct stat status{};
     if (::fstat(item, &status) != 0)
-        return failed("chown", errno);
+        return notGiven(errno);
     // A file with another name elsewhere may belong to somebody else's tree. A name counts once its directory has been
     // given away: before, the former owner could move it on and have it counted again.
     const bool sharedElsewhere =
         !S_ISDIR(status.st_mode) && status.st_nlink > 1 && !(namesAreOf(uid, parent) && namesMet.wasLast(status));
     if (!sharedElsewhere && (status.st_uid != uid || status.st_gid != gid))
         if (const int changed = disk_.changeOwner(item, uid, gid); changed < 0)
-            failed("chown", -changed);
+            notGiven(-changed);
     if (sharedElsewhere || S_ISLNK(status.st_mode)) // Linux keeps no mode for a link
         return;
     if (const int changed = disk_.changeMode(item, standardMode(status.st_mode)); changed < 0)
-        failed("chmod", -changed);
+        log_.write(logLevelError, function, "Could not chmod %s: %s", ZOR_SHOWN(path), errorText(-changed));
 }
 
 Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid) {

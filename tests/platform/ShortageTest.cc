@@ -19,9 +19,9 @@
 #include <new>
 #include <optional>
 
-// ThreadSanitizer has an operator new of its own and lets nobody replace it.
+// The sanitizers have operators new of their own.
 #if defined(__has_feature)
-#if __has_feature(thread_sanitizer)
+#if __has_feature(thread_sanitizer) || __has_feature(address_sanitizer)
 #define ZOR_OPERATOR_NEW_IS_TAKEN
 #endif
 #endif

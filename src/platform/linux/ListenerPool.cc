@@ -375,27 +375,32 @@ void ListenerPool::watch() {
         tick();
     }
     while (!workersJoined_) {
-        interruptReceivers();
+        (void)interruptReceivers();
         watcherWake_.waitFor(mutex_, tick_);
     }
 }
 
 void ListenerPool::tick() {
-    if (waiting_ > 0) {
+    // One that is held costs the others a thread, also while some wait.
+    const bool somebodyReceives = interruptReceivers();
+    if (waiting_ > 0 && !somebodyReceives) {
         watching_ = false;
         // Between the look and the flag the last one may have stopped waiting, and left the flag to this thread.
         if (waiting_ > 0 || watching_.exchange(true))
             return;
     }
-    interruptReceivers();
-    if (canGrow())
+    if (waiting_ == 0 && canGrow())
         makeUpForStuckWorkers();
 }
 
-void ListenerPool::interruptReceivers() {
-    for (const auto& worker : workers_)
+bool ListenerPool::interruptReceivers() {
+    bool somebodyReceives = false;
+    for (const auto& worker : workers_) {
         if (worker->scratch.receiving.hasStayed())
             interruptThread(worker->threadId);
+        somebodyReceives = somebodyReceives || worker->scratch.receiving.isSet();
+    }
+    return somebodyReceives;
 }
 
 void ListenerPool::makeUpForStuckWorkers() {

@@ -16,8 +16,9 @@
 //   - an armed descriptor wakes one worker. A task may still be called for an event that is out of date, or while
 //   another
 //     worker has it (after a rearm from outside): it has to tell that itself.
-// The watcher is a thread that sleeps without a timeout while anybody waits, and ticks while nobody does; an idle pool
-// costs nothing. Handlers that only compute never make the pool grow: the watcher looks at the state of their threads.
+// The watcher is a thread that ticks while nobody waits, and until no receive is under way, and else sleeps without a
+// timeout; an idle pool costs nothing. Handlers that only compute never make the pool grow: the watcher looks at the
+// state of their threads.
 #pragma once
 
 #include "platform/BlockingScope.h"
@@ -134,8 +135,8 @@ private:
     void watch();
     void tick() ZOR_REQUIRES(mutex_);
     void makeUpForStuckWorkers() ZOR_REQUIRES(mutex_);
-    /// Has workers go on that are held in a receive since the last look.
-    void interruptReceivers() ZOR_REQUIRES(mutex_);
+    /// Has workers go on that are held in a receive since the last look; whether any is in one now.
+    bool interruptReceivers() ZOR_REQUIRES(mutex_);
     bool workIsReady() const;
     /// Whether the worker has been in one task since the last tick, has computed next to nothing there, and is not
     /// about to.

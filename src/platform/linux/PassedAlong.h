@@ -7,9 +7,9 @@
 // descriptors at the sender. On others, and for what was sent before a listening socket came to the daemon, a signal
 // ends the wait: the call then returns what it would have returned at once.
 //
-// Receiving for clients is the hot path: it leaves a mark, and the pool's watcher interrupts whoever stays when no
-// other thread waits for work. All other calls on sockets in use that may close something of a peer's are made in an
-// InterruptedScope.
+// Receiving for clients is the hot path: it leaves a mark, and the pool's watcher, which looks whenever no thread
+// waits for work, interrupts whoever stays. All other calls on sockets in use that may close something of a peer's are
+// made in an InterruptedScope.
 #pragma once
 
 #include "platform/FileDescriptor.h"
@@ -49,6 +49,8 @@ public:
         const std::uint64_t now = steps_.load(std::memory_order_relaxed);
         return now == std::exchange(seen_, now) && now % 2 == 1;
     }
+
+    [[nodiscard]] bool isSet() const { return steps_.load(std::memory_order_relaxed) % 2 == 1; }
 
 private:
     void step() { steps_.store(steps_.load(std::memory_order_relaxed) + 1, std::memory_order_relaxed); }
