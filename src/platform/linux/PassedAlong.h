@@ -9,7 +9,7 @@
 //
 // Receiving for clients is the hot path: it leaves a mark, and the pool's watcher, which looks whenever no thread
 // waits for work, interrupts whoever stays. All other calls on sockets in use that may close something of a peer's are
-// made in an InterruptedScope.
+// made in an InterruptedScope, but for the upcall's receives: who gets to that socket owns the root.
 #pragma once
 
 #include "platform/FileDescriptor.h"

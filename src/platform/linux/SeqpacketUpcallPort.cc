@@ -141,12 +141,9 @@ SeqpacketUpcallPort::Received SeqpacketUpcallPort::receive(const Connection& con
     message.msg_control = control;
     message.msg_controllen = sizeof control;
     ssize_t bytes = 0;
-    {
-        const InterruptedScope whatPeersPassed;
-        do {
-            bytes = ::recvmsg(connection.socket.get(), &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
-        } while (bytes < 0 && errno == EINTR);
-    }
+    do {
+        bytes = ::recvmsg(connection.socket.get(), &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+    } while (bytes < 0 && errno == EINTR);
     if (bytes < 0)
         return errno == EAGAIN || errno == EWOULDBLOCK ? Received::nothing : Received::ended;
     bool hasControl = false;
