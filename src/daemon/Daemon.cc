@@ -35,8 +35,8 @@ int Daemon::run() {
         return -1;
     }
     startUp.reset();
-    if (options_.setUp)
-        options_.setUp();
+    if (options_.beforeClients)
+        options_.beforeClients();
     if (startListener() && options_.ready)
         options_.ready();
     platform.runLoop.run();

@@ -17,7 +17,7 @@ public:
     struct Options {
         int logLevel = logLevelNotice;
         /// Runs when all is set up, before the first client can connect: opens what else is served.
-        std::function<void()> setUp;
+        std::function<void()> beforeClients;
         /// Runs when clients can connect, before the run loop: tells the service manager.
         std::function<void()> ready;
     };

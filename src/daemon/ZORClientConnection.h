@@ -100,7 +100,8 @@ public:
     };
     /// Takes the containers out of the store; their files go with the next deletion pass. What is not there is skipped,
     /// what is malformed is logged and skipped. With locking it runs under the all-identifiers lock held for writing;
-    /// without, the caller holds it. Errors 11 (lists that do not agree), 28 (not durable), 46, 40.
+    /// without, the caller holds it. Errors 11 (lists that do not agree), 28 (not durable), 44 (one
+    /// could not be looked for), 46, 40.
     Result<void> stageForDeleteContainersWithUsers(const DeletionBatch& batch, UseLocking useLocking);
     /// Stages the one container of an identifier. Errors as the lookup's and the staging's.
     Result<void> deleteContainerForUser(std::uint32_t userId, const std::string* identifier,

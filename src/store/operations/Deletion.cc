@@ -125,7 +125,7 @@ bool ZORClientConnection::takeAwayForDelete(const FileURL& container, std::vecto
             destination.c_str(), moved.error().text().c_str());
     // An earlier container of a well-known name may still wait on death row under that name. This one goes beside it: a
     // stop while it is removed in place would leave half of it under the name it has.
-    const bool nameIsTaken = (moved.error().isPosix(ENOTEMPTY) || moved.error().isPosix(EEXIST));
+    const bool nameIsTaken = moved.error().isPosix(ENOTEMPTY) || moved.error().isPosix(EEXIST);
     if (nameIsTaken && _moveItemAtURLToDeathRow(container, StartDeletionThread::no)) {
         changed.push_back(deathRow);
         return true;
