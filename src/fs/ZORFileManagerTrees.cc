@@ -62,8 +62,8 @@ Result<void> ZORFileManager::removeItemAtURL(const std::optional<FileURL>& url) 
             log_.write(logLevelError, function, "prunetree hit error for %s : %s", ZOR_SHOWN(path),
                        errorText(failure.error));
         struct stat status{};
-        const bool examined = failure.error == EPERM &&
-                              ::fstatat(failure.parent, failure.name, &status, AT_SYMLINK_NOFOLLOW) == 0;
+        const bool examined =
+            failure.error == EPERM && ::fstatat(failure.parent, failure.name, &status, AT_SYMLINK_NOFOLLOW) == 0;
         if (failure.error == EPERM && !examined)
             log_.write(logLevelError, function, "Failed to stat %s before unsetting UF_IMMUTABLE: %s", ZOR_SHOWN(path),
                        errorText(errno));
