@@ -8,6 +8,7 @@
 #include "platform/linux/LinuxDisk.h"
 #include "support/FaultLoop.h"
 #include "support/FileTree.h"
+#include "support/LongRun.h"
 #include "support/PowerCut.h"
 #include "support/ProcessResources.h"
 
@@ -620,7 +621,7 @@ TEST(Content, OwnerWhoChangesTheContainerMeanwhile) {
     for (const char* name : {"Documents/x", "f", "d/g"})
         entries.push_back(file(name));
     const std::string archive = makeArchive(Form::tar, entries);
-    const auto seconds = std::chrono::seconds(std::getenv("ZORVANE_TEST_LONG") ? 30 : 2);
+    const auto seconds = std::chrono::seconds(zor::support::raceSeconds());
     const auto end = std::chrono::steady_clock::now() + seconds;
     int succeeded = 0;
     int refused = 0;

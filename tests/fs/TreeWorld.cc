@@ -52,13 +52,8 @@ bool inChild(const std::function<bool()>& enter, const std::function<void()>& bo
 
 } // namespace
 
-bool isLongRun() {
-    const char* const value = std::getenv("ZORVANE_TEST_LONG");
-    return value != nullptr && std::string(value) == "1";
-}
-
 std::size_t repeatForRace(const std::function<void()>& body, const std::function<bool()>& isEnough) {
-    const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(isLongRun() ? 30 : 2);
+    const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(support::raceSeconds());
     std::size_t times = 0;
     while (std::chrono::steady_clock::now() < end && !testing::Test::HasFailure() && !(isEnough && isEnough())) {
         body();

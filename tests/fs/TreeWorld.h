@@ -6,6 +6,7 @@
 #include "platform/linux/LinuxDisk.h"
 #include "support/FileTree.h"
 #include "support/Files.h"
+#include "support/LongRun.h"
 
 #include <atomic>
 #include <functional>
@@ -17,6 +18,7 @@ namespace zor::fs::test {
 
 using platform::FileDescriptor;
 using support::exists;
+using support::isLongRun;
 using support::makeDirectory;
 using support::makeFifo;
 using support::makeFile;
@@ -25,8 +27,6 @@ using support::makeLink;
 using support::openDirectory;
 using support::TemporaryDirectory;
 
-/// Races take longer, and large trees are larger, with ZORVANE_TEST_LONG=1.
-bool isLongRun();
 /// Calls `body` again and again for a while, until it is enough or fails; how often.
 std::size_t repeatForRace(const std::function<void()>& body, const std::function<bool()>& isEnough = nullptr);
 std::size_t openDescriptorCount();

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/BlockingScope.h"
 #include "platform/ListenerWorld.h"
+#include "support/LongRun.h"
 
 #include <condition_variable>
 #include <cstdlib>
@@ -315,7 +316,7 @@ TEST(ListenerPool, LateRepliesMeetTheWorkerThatLetsGo) {
     LateReplier replier(150'000);
     world.start([&](PeerConnection&, ServiceEvent& event) { replier.take(event); });
     RawClient client = world.connect();
-    const int rounds = std::getenv("ZORVANE_TEST_LONG") ? 20'000 : 500;
+    const int rounds = support::isLongRun() ? 20'000 : 500;
     for (int round = 0; round < rounds; ++round) {
         constexpr std::uint64_t burst = 4;
         for (std::uint64_t i = 0; i < burst; ++i)

@@ -23,10 +23,6 @@ constexpr const char* everyPower =
 
 } // namespace
 
-double raceSeconds() {
-    return std::getenv("ZORVANE_TEST_LONG") ? 30.0 : 2.0;
-}
-
 zorvane::Client::Lookup dataContainer(const std::string& identifier, bool transient) {
     return {.containerClass = dataApplication,
             .user = mobile,

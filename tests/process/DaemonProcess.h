@@ -65,8 +65,6 @@ private:
 
 /// A data container of user 501's that is made where it is missing.
 zorvane::Client::Lookup dataContainer(const std::string& identifier, bool transient = false);
-/// How long a race is to last: long with ZORVANE_TEST_LONG.
-double raceSeconds();
 
 void writeFile(const std::string& path, const std::string& bytes, mode_t mode = 0644);
 std::string readFile(const std::string& path);

@@ -6,6 +6,7 @@
 #include "soak/HostileOwner.h"
 #include "soak/Life.h"
 #include "soak/Surroundings.h"
+#include "support/LongRun.h"
 
 #include <CLI/CLI.hpp>
 #include <cstdio>
@@ -33,7 +34,7 @@ constexpr bool judgesMemory = true;
 constexpr std::size_t grownDescriptorsMax = 16;
 
 struct Options {
-    double seconds = 60;
+    double seconds = support::isLongRun() ? 60 : 15;
     Count kills = 0;
     Count seed = static_cast<Count>(Clock::now().time_since_epoch().count()) % 1'000'000;
     bool verbose = false;

@@ -4,6 +4,7 @@
 #include "protection/ZORApplicationTerminationAssertion.h"
 #include "protection/ZORDataProtectionChangeOperation.h"
 #include "protection/ZORDataProtectionManager.h"
+#include "support/LongRun.h"
 #include "world/World.h"
 
 #include <algorithm>
@@ -323,7 +324,7 @@ TEST_F(Protection, HostileOwner) {
             (void)::renameat2(AT_FDCWD, (documents / "link").c_str(), AT_FDCWD, (documents / "swapped").c_str(),
                               RENAME_EXCHANGE);
     });
-    const int rounds = std::getenv("ZORVANE_TEST_LONG") ? 20'000 : 500;
+    const int rounds = support::isLongRun() ? 20'000 : 500;
     for (int i = 0; i < rounds; ++i)
         EXPECT_EQ(change(to(i % 2 == 0 ? 3 : 1)), 1U);
     owner.request_stop();

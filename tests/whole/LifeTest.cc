@@ -2,6 +2,7 @@
 // The daemon's life as its users see it: killed at any moment, started twice, told to stop, asked by its tool.
 #include "process/DaemonProcess.h"
 #include "process/Relay.h"
+#include "support/LongRun.h"
 
 #include <atomic>
 #include <filesystem>
@@ -38,7 +39,7 @@ TEST(Life, KilledAtAnyMomentFindsEveryAcknowledgedContainerWhole) {
     std::mt19937 random(20261124);
     std::map<std::string, std::string> acknowledged; // identifier to UUID
     std::mutex mutex;
-    const int rounds = raceSeconds() > 10 ? 40 : 6;
+    const int rounds = support::isLongRun() ? 40 : 6;
     for (int round = 0; round < rounds; ++round) {
         daemon.start();
         std::vector<std::thread> creators;

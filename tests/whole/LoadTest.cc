@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Many clients at once, some of which die, and an owner of the trees who moves things about.
 #include "process/DaemonProcess.h"
+#include "support/LongRun.h"
 
 #include <atomic>
 #include <csignal>
@@ -23,7 +24,7 @@ namespace {
 using Clock = std::chrono::steady_clock;
 
 Clock::time_point endOfRace() {
-    return Clock::now() + std::chrono::duration_cast<Clock::duration>(std::chrono::duration<double>(raceSeconds()));
+    return Clock::now() + std::chrono::duration_cast<Clock::duration>(std::chrono::seconds(support::raceSeconds()));
 }
 
 /// One client's life: random commands on few identifiers, so that clients meet. Counts answers that must not be.

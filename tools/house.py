@@ -1,0 +1,198 @@
+#!/usr/bin/env python3
+# SPDX-License-Identifier: Apache-2.0
+"""The rules of the house that no compiler knows, as a part of ./dev lint.
+
+Calls that pass by the layer that owns them, includes that go up (the table is docs/architecture.md's), circles of headers,
+sources without a head, checks that were silenced, and a page of threats that names tests which do not exist. Prints one line
+for each fault and ends with 1. Before it judges the tree it breaks each rule once and ends with 2 where that stays unseen.
+"""
+import re
+import sys
+from pathlib import Path
+
+ROOT = Path(__file__).resolve().parent.parent
+KERNEL = ("src/fs/", "src/platform/linux/", "client/", "tools/")  # tools run with their user's rights, on their user's paths
+DISK = ("src/platform/linux/", "client/", "tools/")
+PATHS = "a descriptor and src/fs: a path can be swapped between two calls"
+MUTEX = "platform/Mutex.h: the lint build checks its locks"
+# Words of the programs' code, folders or files in which they may stand, what to use instead. "::f(" is the global function.
+CALLS = [
+    ("std::filesystem <filesystem> std::ifstream std::ofstream std::fstream", (), PATHS),
+    ("::open( ::creat( ::fopen( ::stat( ::lstat( ::access( ::opendir( ::readlink(", KERNEL, PATHS),
+    # A home may be reached through links that its administrator made; it is resolved once.
+    ("::realpath(", KERNEL[:2] + ("src/store/ZORPerUserConfiguration.cc",), PATHS),
+    ("::truncate( ::rename( ::unlink( ::remove( ::rmdir( ::mkdir( ::link( ::symlink( ::chmod( ::chown( ::lchown( ::renameat( "
+     "::renameat2( ::unlinkat( ::mkdirat( ::linkat( ::symlinkat( ::fchmod( ::fchmodat( ::fchown( ::fchownat( ::ftruncate( "
+     "::fsetxattr( ::futimens( ::utimensat( ::fsync( ::fdatasync( ::syncfs( ::sync_file_range(",
+     DISK, "platform/Disk.h: crash tests have to see every change"),
+    ("std::mutex std::recursive_mutex std::lock_guard std::unique_lock std::scoped_lock std::condition_variable",
+     ("src/platform/Mutex.h",), MUTEX),
+    # Locks that are looked up by identifier are beyond what the analysis can follow.
+    ("std::shared_mutex", ("src/platform/Mutex.h", "src/daemon/base/ZORLocks"), MUTEX),
+    ("::accept( ::dup( ::dup2( ::pipe( ::epoll_create( ::inotify_init(", (), "the call that takes a flag for CLOEXEC"),
+    ("sprintf strcpy strcat strtok", (), "what knows the buffer's size"),
+    ("atoi", (), "std::from_chars, which tells a failure"),
+    ("localtime gmtime", (), "localtime_r, gmtime_r"),
+    ("getpwuid getpwnam", (), "the user database of the system root"),
+    ("system( popen(", (), "nothing: no shell is started by a daemon that serves hostile strings"),
+    ("const_cast", (), "a type that says what is changed"),
+]
+# In any text of the checkout; written so that this file holds none of them.
+TEXTS = [(r"#if [0]", "removing the code: history keeps it"), (r"\b(FIX[M]E|TO[D]O)\b", "doing it"),
+         (r"\bDISABLED[_]", "a test that runs, or none"), (r"specif[i]cation", "this system's own words"),
+         (r"Part [0-9]\.[0-9]", "this system's own words"), (r"NO[L]INT(NEXTLINE|BEGIN|END)?(?![\w(])", "the check's name")]
+TOKEN = re.compile(r'R"([^(\s]*)\((?:.|\n)*?\)\1"|//[^\n]*|/\*(?:.|\n)*?\*/|"(?:\\.|[^"\\\n])*"|(?<!\w)\'(?:\\.|[^\'\\\n])*\'')
+
+
+def code_of(text, keep_literals=False):
+    """The text with its comments, and its literals if they are not kept, blanked; lines keep their numbers."""
+    def blank(match):
+        token = match[0]
+        return token if keep_literals and token[0] != "/" else re.sub(r"[^\n]", " ", token)
+    return TOKEN.sub(blank, text)
+
+
+def pattern_of(word):
+    before = r"(?<![\w>])" if word.startswith("::") else r"(?<!\w)" if word[0].isalpha() else ""
+    return re.compile(before + re.escape(word) + (r"(?!\w)" if word[-1].isalnum() else ""))
+
+
+PATTERNS = [(pattern_of(word), word, allowed, instead) for words, allowed, instead in CALLS for word in words.split()]
+
+
+def lines_with(pattern, text):
+    return [text.count("\n", 0, match.start()) + 1 for match in pattern.finditer(text)]
+
+
+def call_faults(path, text):
+    code = code_of(re.sub(r"(?m)^\s*#\s*include\s*<(filesystem)>", r"<\1>", text))
+    return [f"{path}:{line}: {word} stands here; use {instead}" for pattern, word, allowed, instead in PATTERNS
+            if not path.startswith(allowed or ("\0",)) for line in lines_with(pattern, code)]
+
+
+def text_faults(path, text):
+    return [f"{path}:{line}: use {instead}" for pattern, instead in TEXTS for line in lines_with(re.compile(pattern), text)]
+
+
+def head_faults(path, text, has_header):
+    lines = text.splitlines()
+    faults = []
+    if lines[:1] != ["// SPDX-License-Identifier: Apache-2.0"]:
+        faults.append(f"{path}:1: does not begin with the licence line")
+    if not has_header and not (lines[1:2] and lines[1].startswith("// ")):
+        faults.append(f"{path}:2: does not say what the file is for")
+    if path.endswith(".h") and "#pragma once" not in lines:
+        faults.append(f"{path}: has no #pragma once")
+    if path.startswith("src/") and len(lines) > 600:
+        faults.append(f"{path}: has {len(lines)} lines; over 600, a second thing lives in it")
+    return faults
+
+
+def rules_of(page):
+    """Rows are "| `folder` | may include | its sources also |": for each folder, what its files and its sources may include."""
+    rules, above = {}, set()
+    for cells in re.findall(r"(?m)^\|([^|\n]*)\|([^|\n]*)\|([^|\n]*)\|$", page):
+        first, both, sources = (set(re.findall(r"`([^`]*)`", cell)) for cell in cells)
+        if len(first) != 1:
+            continue
+        folder = first.pop()
+        rules[folder] = (both | {folder} | (above if "all above" in cells[1].lower() else set()), sources)
+        if folder.startswith("src/") and folder != "src/platform/linux":
+            above = above | {folder}
+    return rules
+
+
+def rule_folder(rules, path):
+    if path.startswith("src/"):
+        return path.rpartition("/")[0]
+    return next((folder for folder in sorted(rules, key=len, reverse=True) if path.startswith(folder + "/")), "")
+
+
+def includes_of(files, path):
+    own = [] if path.startswith("src/") else [path.rpartition("/")[0] + "/"]
+    bases = own + ["src/"] + ([] if path.startswith("src/") else ["client/include/", "client/"])
+    for name in re.findall(r'(?m)^\s*#\s*include\s*"([^"]*)"', code_of(files[path], keep_literals=True)):
+        yield name, next((base + name for base in bases if base + name in files), "")
+
+
+def include_faults(rules, files):
+    faults, reaches = [], {}
+    for path in files:
+        folder = rule_folder(rules, path)
+        if folder not in rules:
+            faults.append(f"{path}: its folder is not in docs/architecture.md")
+            continue
+        allowed = rules[folder][0] | (rules[folder][1] if path.endswith(".cc") else set())
+        for name, target in includes_of(files, path):
+            if path.endswith(".h"):
+                reaches.setdefault(path, set()).add(target)
+            if not target or not {target, rule_folder(rules, target)} & allowed:
+                faults.append(f'{path}: "{name}" may not be included from {folder} (docs/architecture.md)')
+    left = {path for path in files if path.endswith(".h")}
+    while end := {path for path in left if not reaches.get(path, set()) & left}:
+        left -= end  # those that remain at last are on a circle of includes, or lead to one
+    return faults + [f"{path}: is on a circle of includes" for path in sorted(left)]
+
+
+def page_faults(page, tests):
+    rows = [line for line in page.splitlines() if line.startswith("| **")]
+    faults = [f"docs/security.md: no test: {row[:60]}" for row in rows if not re.search(r"`\w+\.\w+`", row)]
+    return faults + [f"docs/security.md: no test has the name {name}" for row in rows
+                     for name in re.findall(r"`(\w+\.\w+)`", row) if name not in tests]
+
+
+def below(folders, endings):
+    paths = [path for folder in folders for path in ([ROOT / folder] if (ROOT / folder).is_file() else (ROOT / folder).rglob("*"))
+             if path.is_file() and path.name.endswith(endings)]
+    return {str(path.relative_to(ROOT)): path.read_text() for path in sorted(paths)}
+
+
+def blind_rules():
+    """The rules that a broken line passes."""
+    blind = [word for _, word, _, _ in PATTERNS if len(call_faults("src/store/A.cc", f"auto x = {word}(a);\n")) != 1
+             or call_faults("src/store/A.cc", f'// {word}(a)\nauto s = R"({word}()"; char c = \'"\'; f("{word}(");\n')]
+    head = "// SPDX-License-Identifier: Apache-2.0\n// Purpose.\n"
+    rules = rules_of("| `src/low` | nothing | |\n| `src/top` | all above | |\n")
+    pairs = {"src/low/A.h": '#include "top/B.h"\n', "src/top/B.h": '#include "low/A.h"\n', "src/new/C.h": ""}
+    checks = {
+        "texts": all(len(text_faults("a", text)) == 1 for text in
+                     ["#if " + "0", "FIX" + "ME", "DISABLED" + "_A", "Specif".lower() + "ication", "Part " + "3.4", "NO" + "LINT"]),
+        "texts that only look like it": not text_faults("a", "NO" + "LINTNEXTLINE(bugprone-x)\n"),
+        "heads": [len(head_faults("src/A.h", text, False)) for text in
+                  (head + "#pragma once\n", head, "#pragma once\n", head + "#pragma once\n" * 600)] == [0, 1, 2, 1],
+        "includes": len(include_faults(rules, pairs)) == 4,
+        "tests of the page": len(page_faults("| **A** | b | `No.Test` |\n| **A** | b | c |\n", {"A.B"})) == 2,
+    }
+    return blind + [name for name, holds in checks.items() if not holds]
+
+
+def main():
+    if blind := blind_rules():
+        print("tools/house.py: these rules cannot fail: " + ", ".join(blind))
+        return 2
+    code = ("src", "client", "tools", "tests", "bench", "fuzz")
+    sources = below(code, (".h", ".cc"))
+    programs = {path: text for path, text in sources.items() if path.startswith(("src/", "client/", "tools/"))}
+    rules = rules_of((ROOT / "docs/architecture.md").read_text())
+    tests = {f"{suite}.{name}" for path, text in sources.items() if path.startswith("tests/")
+             for suite, name in re.findall(r"(?m)^TEST(?:_F|_P)?\((\w+), (\w+)\)", text)}
+    faults = include_faults(rules, programs) + page_faults((ROOT / "docs/security.md").read_text(), tests)
+    faults += [f"docs/architecture.md: there is no {name}" for folder, allowed in rules.items()
+               for name in {folder} | allowed[0] | allowed[1] if not (ROOT / name).exists()]
+    for path, text in programs.items():
+        faults += call_faults(path, text)
+    for path, text in sources.items():
+        faults += head_faults(path, text, path[:-3] + ".h" in sources or path.endswith("Test.cc"))
+    everything = code + ("docs", "packaging", "cmake", "dev", ".ci/run", "CMakeLists.txt", "README.md", "CHANGELOG.md",
+                         "CONTRIBUTING.md", "SECURITY.md")
+    endings = (".h", ".cc", ".py", ".md", ".txt", ".cmake", ".sh", ".service", ".socket", ".in", ".1", ".3", ".5", ".8", "dev", "run")
+    for path, text in below(everything, endings).items():
+        faults += text_faults(path, text)
+    if len(rules) < 10 or len(tests) < 100 or not programs:
+        faults.append("tools/house.py: the table, the tests or the sources were not found")
+    print("\n".join(faults), end="\n" if faults else "")
+    return 1 if faults else 0
+
+
+if __name__ == "__main__":
+    sys.exit(main())
