@@ -73,45 +73,6 @@ TEST(Log, LevelGate) {
     }
 }
 
-// Only level 3 of the thread that serves the client counts against its user: a gate that refuses all, nested scopes,
-// another thread.
-TEST(Log, ProvokedLinesAskTheGate) {
-    support::RecordingLog sink(logLevelDebug);
-    Log log(sink);
-    std::vector<std::uint32_t> asked;
-    log.limitRefusals([&](std::uint32_t userId) {
-        asked.push_back(userId);
-        return false;
-    });
-    log.write(3, "f", "before");
-    {
-        const Log::ClientScope outer(501);
-        log.write(3, "f", "refused");
-        log.write(5, "f", "notable");
-        {
-            const Log::ClientScope inner(502);
-            log.write(3, "f", "refused too");
-        }
-        std::thread([&] { log.write(3, "f", "elsewhere"); }).join();
-        log.write(3, "f", "refused again");
-    }
-    log.write(3, "f", "after");
-    EXPECT_EQ(asked, (std::vector<std::uint32_t>{501, 502, 501}));
-    EXPECT_EQ(sink.take(), (std::vector<LogLine>{
-                               {3, "f", "before"}, {5, "f", "notable"}, {3, "f", "elsewhere"}, {3, "f", "after"}}));
-}
-
-TEST(Log, ShowsObjectsCutAndAbsentOnes) {
-    const std::string exact(shownBytesMax, 'x');
-    const std::string longer = exact + "y";
-    const std::optional<std::string> absent;
-    EXPECT_EQ(std::string(ZOR_SHOWN(longer)), exact);
-    EXPECT_EQ(std::string(ZOR_SHOWN(exact)), exact);
-    EXPECT_STREQ(ZOR_SHOWN(absent), "(null)");
-    EXPECT_STREQ(ZOR_SHOWN(static_cast<const std::string*>(nullptr)), "(null)");
-    EXPECT_EQ(formatted("%s!", longer.c_str()), longer + "!"); // longer than the small buffer
-}
-
 class Build final : public platform::InternalBuildQuery {
 public:
     explicit Build(bool internal) : internal_(internal) {}

@@ -53,32 +53,6 @@ protected:
     }
 };
 
-TEST_F(Locks, SeveralAreTakenOnceEachAscendingAndReleasedDescending) {
-    locks._lock_identifier(std::vector<std::string>{"B", "A", "B"}, LockMode::writing);
-    EXPECT_EQ(locks.identifiersInUse(), 2U);
-    EXPECT_EQ(sink.take(), (std::vector<support::LogLine>{
-                               {7, "take_one_lock", "Waiting to lock A for writing"},
-                               {7, "take_one_lock", "Got lock on identifier A"},
-                               {7, "take_one_lock", "Waiting to lock B for writing"},
-                               {7, "take_one_lock", "Got lock on identifier B"},
-                           }));
-    locks.unlock_identifier(std::vector<std::string>{"B", "A", "B"});
-    EXPECT_EQ(sink.take(), (std::vector<support::LogLine>{
-                               {7, "unlock_one_lock", "Unlocked identifier B"},
-                               {7, "unlock_one_lock", "Destroying lock for identifier B"},
-                               {7, "unlock_one_lock", "Unlocked identifier A"},
-                               {7, "unlock_one_lock", "Destroying lock for identifier A"},
-                           }));
-    EXPECT_EQ(locks.identifiersInUse(), 0U);
-    locks._lock_all_identifiers(LockMode::reading);
-    locks.unlock_all_identifiers();
-    EXPECT_EQ(sink.take(), (std::vector<support::LogLine>{
-                               {7, "_lock_all_identifiers", "Waiting to lock all identifiers for reading"},
-                               {7, "_lock_all_identifiers", "Locked all identifiers for reading"},
-                               {7, "unlock_all_identifiers", "Unlocked all identifiers"},
-                           }));
-}
-
 // Every pair of lock requests excludes or admits as it should: the first is held, the second asked for in another
 // thread; one that has to wait ends after the release, and not before.
 TEST_F(Locks, WhoWaitsForWhom) {

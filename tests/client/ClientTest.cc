@@ -310,22 +310,5 @@ TEST(Client, EveryCodeHasItsWords) {
     EXPECT_TRUE(std::ranges::is_sorted(errorCodes()));
 }
 
-// People's words for classes, full names, numbers or short forms, mean the right number, and nothing vague means any.
-TEST(Client, WordsForClasses) {
-    for (std::uint64_t number = 1; number <= containerClassMax; ++number) {
-        EXPECT_EQ(containerClassOf(ipc::containerClassNames[number]), number);
-        EXPECT_EQ(containerClassOf(std::to_string(number)), number);
-        EXPECT_EQ(containerClassName(number), ipc::containerClassNames[number]);
-    }
-    EXPECT_EQ(containerClassOf("data-app"), 2U);
-    EXPECT_EQ(containerClassOf("bundle-app"), 1U);
-    for (const char* wrong :
-         {"", "0", "14", "-1", "2x", "99999999999999999999", "data", "shared", "Data/", "Undefined"})
-        EXPECT_FALSE(containerClassOf(wrong)) << wrong;
-    EXPECT_EQ(defaultUserOfClass(1), 33U);
-    EXPECT_EQ(defaultUserOfClass(2), currentMobileUser);
-    EXPECT_EQ(defaultUserOfClass(12), 499U);
-}
-
 } // namespace
 } // namespace zorvane

@@ -85,22 +85,6 @@ TEST_F(FileManager, RefusesWhatStandsInThePlace) {
     EXPECT_NE(::access("/dev/shm/zorvane-elsewhere", F_OK), 0);
 }
 
-// Goal: the final name exists only when all is set. Method: fail each call of a creation; unchecked ones (mode, owner)
-// go on, checked ones leave at most a temporary sibling.
-TEST_F(FileManager, AFailingDiskNeverLeavesAHalfMadeName) {
-    for (const DiskCall call : {DiskCall::makeDirectory, DiskCall::rename, DiskCall::setAttribute}) {
-        failNext(call, EIO);
-        const auto made =
-            manager().createDirectoryAtURL(url("d"), Intermediates::no, {.mode = 0755, .protectionClass = 4});
-        ASSERT_TRUE(disk.met()) << support::nameOf(call);
-        ASSERT_FALSE(made) << support::nameOf(call);
-        EXPECT_TRUE(made.error().isPosix(EIO));
-        EXPECT_EQ(item("d"), "missing");
-    }
-    failNext(DiskCall::changeMode, EIO);
-    EXPECT_TRUE(manager().createDirectoryAtURL(url("d"), Intermediates::no, {.mode = 0711}));
-}
-
 TEST_F(FileManager, GivesDirectoriesTheirClassAtCreation) {
     const std::pair<DirectoryAttributes, int> rows[] = {
         {{.protectionClass = 4}, 4}, {{.protectionClass = 0}, 0}, {{}, 0}};

@@ -70,28 +70,6 @@ TEST_F(FileManager, MovesAndCopies) {
     EXPECT_EQ(item("copy/f").substr(0, 6), "100644");
 }
 
-TEST_F(FileManager, AFailedCopyLeavesNothingUnderTheFinalName) {
-    makeItems({"from/", "from/a", "from/b"});
-    for (std::size_t point = 1;; ++point) {
-        disk.arm({.point = point});
-        const auto copied = manager().copyItemAtURL(url("from"), url("to"));
-        const bool met = disk.met();
-        disk.disarm();
-        if (copied) {
-            EXPECT_EQ(names("to"), (std::vector<std::string>{"a", "b"})) << point;
-            EXPECT_EQ(content("to/a") + content("to/b"), "xx") << point;
-            ASSERT_TRUE(manager().removeItemAtURL(url("to")));
-        } else {
-            EXPECT_EQ(item("to"), "missing") << point;
-        }
-        for (const FileURL& leftover : manager().copyLeftoversInDirectoryAtURL(url("")))
-            EXPECT_TRUE(manager().removeItemAtURL(leftover));
-        EXPECT_EQ(names(""), (std::vector<std::string>{"from", "run"})) << point;
-        if (!met)
-            return;
-    }
-}
-
 // Goal: across file systems a move copies, then removes; a copy that fails leaves the source alone. Method: a child in
 // a mount namespace of its own with a small tmpfs below the root.
 TEST_F(FileManager, MovesAcrossFileSystems) {
@@ -129,66 +107,6 @@ TEST_F(FileManager, MovesAcrossFileSystems) {
     });
     if (!permitted)
         GTEST_SKIP() << "skipped: no mount namespace to be had";
-}
-
-bool setImmutable(const std::string& path, bool immutable) {
-    const platform::FileDescriptor file(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-    int flags = 0;
-    if (::ioctl(file.get(), FS_IOC_GETFLAGS, &flags) != 0)
-        return false;
-    flags = immutable ? flags | FS_IMMUTABLE_FL : flags & ~FS_IMMUTABLE_FL;
-    return ::ioctl(file.get(), FS_IOC_SETFLAGS, &flags) == 0;
-}
-
-// Goal: removal goes as far as it can, is stopped by no immutable file, and its first failure is the error. Method:
-// trees with one item of each kind.
-TEST_F(FileManager, RemovesTrees) {
-    EXPECT_TRUE(manager().removeItemAtURL(url("missing")));
-    EXPECT_TRUE(manager().removeItemAtURL(url("missing/below")));
-    expectPosix(manager().removeItemAtURL(std::nullopt), EFAULT, "nil url passed to -removeItemAtURL:error:");
-    EXPECT_TRUE(lines.take().empty());
-    makeItems({"outside/", "outside/kept", "tree/"});
-    makeDirectory("tree/closed", 0);
-    makeItems({"tree/link -> ../outside", "tree/a", "tree/b"});
-    fail(support::FaultSpan::fromThenOn, DiskCall::unlinkFile, EACCES, "a");
-    const auto failed = manager().removeItemAtURL(url("tree"));
-    disk.disarm();
-    expectPosix(failed, EACCES, "prunetree of " + path("tree") + " failed: Permission denied");
-    EXPECT_EQ(names("tree"), (std::vector<std::string>{"a"}));
-    EXPECT_TRUE(hasLine(lines.take(), 3, "removeItemAtURL",
-                        "prunetree hit error for " + path("tree/a") + " : Permission denied"));
-    EXPECT_EQ(names("outside"), (std::vector<std::string>{"kept"}));
-    makeLink("tree/again", "../outside");
-    EXPECT_TRUE(manager().removeItemAtURL(url("tree/again")));
-    EXPECT_TRUE(manager().removeItemAtURL(url("tree")));
-    EXPECT_EQ(names(""), (std::vector<std::string>{"outside", "run"}));
-}
-
-TEST_F(FileManager, RemovesImmutableFiles) {
-    makeItems({"tree/", "tree/file", "tree/other"});
-    if (!setImmutable(path("tree/file"), true))
-        GTEST_SKIP() << "skipped: no immutable files here";
-    for (const auto& [call, line] :
-         {std::pair(DiskCall::setInodeFlags, "Failed to lchflags "), std::pair(DiskCall::unlinkFile, "unlink of ")}) {
-        const bool unlinks = call == DiskCall::unlinkFile; // the second time, of what is mutable now
-        disk.arm({.point = unlinks ? 2U : 1U, .filter = [&](const auto& info) {
-                      return info.call == call && (!unlinks || info.subject == "file");
-                  }});
-        EXPECT_FALSE(manager().removeItemAtURL(url("tree")));
-        disk.disarm();
-        EXPECT_EQ(names("tree"), (std::vector<std::string>{"file"})) << line;
-        const auto said = lines.take(3, "removeItemAtURL");
-        EXPECT_TRUE(std::ranges::any_of(said, [&](const std::string& one) { return one.starts_with(line); })) << line;
-    }
-    setImmutable(path("tree/file"), true);
-    const auto removed = manager().removeItemAtURL(url("tree"));
-    setImmutable(path("tree/file"), false);
-    EXPECT_TRUE(removed) << removed.error().text();
-    EXPECT_EQ(item("tree"), "missing");
-    const auto said = lines.take();
-    EXPECT_TRUE(hasLine(said, 3, "removeItemAtURL",
-                        "prunetree hit error for " + path("tree/file") + " : Operation not permitted"));
-    EXPECT_TRUE(hasLine(said, 5, "removeItemAtURL", "Unset UF_IMMUTABLE on " + path("tree/file")));
 }
 
 // Goal: everything but metadata files gets the owner and 0755 or 0644; what has a name outside keeps its own. Method:
@@ -233,30 +151,6 @@ TEST_F(FileManager, StandardisesOwnership) {
                         "Could not chown " + path("tree/plain") + ": Read-only file system"));
     expectPosix(manager().standardizeOwnershipAtURL(url("no"), 501, 501), ENOENT,
                 "Could not stat " + path("no") + ": No such file or directory");
-}
-
-TEST_F(FileManager, PrintsOrphansAndMeasures) {
-    makeDirectory("junk");
-    makeFile("junk/f", std::string(5000, 'x'));
-    makeLink("junk/dangling", "nowhere");
-    manager().printDirectoryStructureAtURL(url("junk"));
-    auto said = lines.take(3, "printDirectoryStructureAtURL");
-    std::ranges::sort(said);
-    EXPECT_EQ(said,
-              (std::vector<std::string>{"\tOrphaned File: " + path("junk"), "\tOrphaned File: " + path("junk/dangling"),
-                                        "\tOrphaned File: " + path("junk/f")}));
-    EXPECT_GE(manager().diskUsageForURL(url("junk")), 5000U);
-    EXPECT_EQ(manager().diskUsageForURL(url("junk/f")), 0U);
-    EXPECT_EQ(lines.take(3, "diskUsageForURL"),
-              (std::vector<std::string>{"Failed to open directory " + path("junk/f") + " : Not a directory"}));
-    // What is not there, or is no place at all.
-    manager().printDirectoryStructureAtURL(url("no"));
-    manager().printDirectoryStructureAtURL(url("no/such"));
-    EXPECT_EQ(lines.take(3, "printDirectoryStructureAtURL"),
-              (std::vector<std::string>{"FTS returned error for " + path("no") + " : No such file or directory",
-                                        "fts_open failed for " + path("no/such") + " : No such file or directory"}));
-    EXPECT_EQ(manager().diskUsageForURL(FileURL()), 0U);
-    EXPECT_EQ(lines.take(3, "diskUsageForURL"), (std::vector<std::string>{"Failed to get path to url "}));
 }
 
 } // namespace

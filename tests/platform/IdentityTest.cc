@@ -181,27 +181,6 @@ TEST(IdentityRegistry, FollowsChanges) {
     world.registry.unfollow(loop);
 }
 
-// The same within about a second when nobody reads the notices, and when there are none (the target of a second link).
-TEST(IdentityRegistry, LooksOnceASecondByItself) {
-    PeerWorld world;
-    const auto link = [&](const char* target, const char* name) {
-        ASSERT_EQ(::symlink(target, world.test.path(name).c_str()), 0);
-    };
-    world.test.makeDirectories("away");
-    link("middle", "first");
-    link("away/last", "middle");
-    link("../agent", "away/last");
-    world.registerAs("a.plist", "first", "agent");
-    const PeerProcess process(world.server, world.program("agent"));
-    const auto peer = world.peerOf(process);
-    EXPECT_EQ(who(*peer), "agent");
-    world.registerAs("a.plist", "first", "changed");
-    EXPECT_TRUE(eventually([&] { return who(*peer) == "changed"; }));
-    std::filesystem::remove(world.test.path("away/last"));
-    link("../other", "away/last");
-    EXPECT_TRUE(eventually([&] { return who(*peer) == "-"; }, std::chrono::seconds(3)));
-}
-
 // A new peer finds what was registered just before it came, also through a link, and nothing is leaked.
 TEST(IdentityRegistry, KnowsWhatWasRegisteredJustNow) {
     PeerWorld world;

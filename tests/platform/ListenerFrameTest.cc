@@ -214,30 +214,6 @@ TEST(ListenerFrame, CancelEndsTheConnectionWithoutReply) {
     EXPECT_EQ(world.counts.others, 0);
 }
 
-// A request cut at every length, then a close, or a reset, which is a close with a reply unread: nothing is left
-// behind.
-TEST(ListenerFrame, PeersThatVanishMidFrameLeaveNothing) {
-    ListenerWorld world;
-    world.start();
-    const plist::Data whole = frameOf(withData(100), 1);
-    int connections = 0;
-    for (std::size_t length = 0; length <= whole.size(); ++length) {
-        for (const bool hard : {false, true}) {
-            RawClient client = world.connect();
-            if (hard) {
-                ASSERT_TRUE(client.send(numbered(1), 1));
-                std::uint8_t first = 0;
-                ASSERT_EQ(::recv(client.socket(), &first, 1, MSG_PEEK), 1);
-            }
-            ASSERT_TRUE(client.send(partOf(whole, 0, length)));
-            ++connections;
-        }
-    }
-    EXPECT_TRUE(eventually([&] { return world.counts.invalids == connections; }));
-    EXPECT_TRUE(world.isAtRest());
-    EXPECT_EQ(world.counts.others, 0);
-}
-
 // Stop ends half a frame, kept replies and waiting requests: every connection gets its invalid event, and every charge
 // is given back (the listener asserts it).
 TEST(ListenerFrame, StopEndsEverything) {

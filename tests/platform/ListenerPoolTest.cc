@@ -178,27 +178,6 @@ TEST(ListenerPool, GrowsAtOnceWhenWorkersSaySo) {
         EXPECT_TRUE(client.receive());
 }
 
-// Handlers that only compute, for several ticks of the watcher, never make the pool grow.
-TEST(ListenerPool, ComputingDoesNotMakeItGrow) {
-    ListenerWorld world;
-    world.limits.threadsRunning = 2;
-    world.start([](PeerConnection&, ServiceEvent& event) {
-        timespec begin = {};
-        timespec now = {};
-        ::clock_gettime(CLOCK_THREAD_CPUTIME_ID, &begin);
-        do
-            ::clock_gettime(CLOCK_THREAD_CPUTIME_ID, &now);
-        while ((now.tv_sec - begin.tv_sec) * 1'000'000'000 + now.tv_nsec - begin.tv_nsec < 40'000'000);
-        event.reply->send(event.request);
-    });
-    std::vector<RawClient> clients = world.connect(12);
-    for (RawClient& client : clients)
-        ASSERT_TRUE(client.send(numbered(1), 1));
-    for (RawClient& client : clients)
-        EXPECT_TRUE(client.receive());
-    EXPECT_EQ(world.counters().threadsMost, 2U);
-}
-
 // Scopes inside scopes, some waiting, some not, under load, lose no request and end in the same small pool.
 TEST(ListenerPool, CountsStayRightUnderMixedLoad) {
     ListenerWorld world;
@@ -306,59 +285,6 @@ TEST(ListenerPool, ConnectionsEndWhileRepliesAreUnderWay) {
     EXPECT_TRUE(world.isAtRest());
     EXPECT_EQ(world.counts.invalids, static_cast<int>(world.counters().connectionsAccepted));
     EXPECT_EQ(world.counts.others, 0);
-}
-
-// A reply that arms the connection just when its worker lets it go neither gets lost nor brings a second worker in:
-// each is more than the socket takes, and nothing else would wake the connection. More rounds with ZORVANE_TEST_LONG.
-TEST(ListenerPool, LateRepliesMeetTheWorkerThatLetsGo) {
-    ListenerWorld world;
-    world.limits.threadsRunning = 3;
-    LateReplier replier(150'000);
-    world.start([&](PeerConnection&, ServiceEvent& event) { replier.take(event); });
-    RawClient client = world.connect();
-    const int rounds = support::isLongRun() ? 20'000 : 500;
-    for (int round = 0; round < rounds; ++round) {
-        constexpr std::uint64_t burst = 4;
-        for (std::uint64_t i = 0; i < burst; ++i)
-            ASSERT_TRUE(client.send(numbered(i), i));
-        for (std::uint64_t i = 0; i < burst; ++i)
-            ASSERT_TRUE(client.receive()) << "round " << round;
-    }
-    client.close();
-    EXPECT_TRUE(world.isAtRest());
-}
-
-std::uint64_t switchesOfListenerThreads() {
-    std::uint64_t sum = 0;
-    for (const auto& task : std::filesystem::directory_iterator("/proc/self/task")) {
-        std::ifstream status(task.path() / "status");
-        bool ours = false;
-        for (std::string line; std::getline(status, line);) {
-            if (line.starts_with("Name:"))
-                ours = line.contains("listener");
-            if (ours && line.starts_with("voluntary_ctxt_switches:"))
-                sum += std::stoull(line.substr(line.find(':') + 1));
-        }
-    }
-    return sum;
-}
-
-// An idle listener runs no code at all, also after it has been busy: its threads' context switches do not change.
-TEST(ListenerPool, IdleCostsNothing) {
-    ListenerWorld world;
-    world.limits.threadsRunning = 2;
-    world.limits.threadIdle = std::chrono::milliseconds(50);
-    Blocked blocked(world, Announced::no);
-    blocked.add(4);
-    RawClient other = world.connect();
-    EXPECT_TRUE(other.isServed());
-    blocked.letGo();
-    ASSERT_TRUE(eventually([&] { return world.counters().threads == 2; }));
-    std::this_thread::sleep_for(std::chrono::milliseconds(100));
-    const std::uint64_t before = switchesOfListenerThreads();
-    EXPECT_GT(before, 0U);
-    std::this_thread::sleep_for(std::chrono::milliseconds(300));
-    EXPECT_EQ(switchesOfListenerThreads(), before);
 }
 
 } // namespace

@@ -169,22 +169,6 @@ TEST(RotatingLog, WritesToStandardErrorWithoutWaitingForever) {
     EXPECT_EQ(log.lines().size(), 3001U);
 }
 
-// Lines of many threads are whole, and none is lost, while files rotate.
-TEST(RotatingLog, SerialisesThreads) {
-    FileLog log(4, 20'000);
-    inThreads(4, [&](unsigned thread) {
-        for (int i = 0; i < 200; ++i)
-            log.write("thread " + std::to_string(thread) + " line " + std::to_string(i) + ".");
-    });
-    std::size_t lines = 0;
-    for (unsigned index = 0; index < 4; ++index)
-        for (const std::string& line : log.lines(index)) {
-            EXPECT_TRUE(line.ends_with(".") && line.contains("thread ")) << line;
-            ++lines;
-        }
-    EXPECT_EQ(lines, 800U);
-}
-
 // Each user has so many lines a second, what is left out is told exactly once, and the table of users is bounded.
 TEST(RefusalLimiter, CountsWhatItLeavesOut) {
     RefusalLimiter::Clock::time_point now{};

@@ -85,25 +85,6 @@ TEST(SerialWorkQueue, FinishesOrDropsWhatIsQueued) {
     EXPECT_EQ(held.use_count(), 1);
 }
 
-// The background queue stands behind everything else, and its thread can be told from others.
-TEST(SerialWorkQueue, BackgroundIsIdle) {
-    int policy = -1;
-    long ioPriority = -1;
-    char name[16] = {};
-    {
-        SerialWorkQueue queue("com.veltra.zorvaned.deathrow", WorkQueue::Priority::background);
-        ASSERT_TRUE(queue.start());
-        queue.async([&] {
-            policy = ::sched_getscheduler(0);
-            ioPriority = ::syscall(SYS_ioprio_get, 1, 0);
-            ::pthread_getname_np(::pthread_self(), name, sizeof name);
-        });
-    }
-    EXPECT_EQ(policy, SCHED_IDLE);
-    EXPECT_EQ(ioPriority >> 13, 3);
-    EXPECT_STREQ(name, "deathrow");
-}
-
 // A callback that unwatches another one whose event is already fetched prevents it; a descriptor number that is used
 // again is not mistaken for the old one.
 TEST(EpollRunLoop, CallsOnlyWhatIsStillWatched) {

@@ -193,27 +193,6 @@ TEST(WantOfMemory, EndsOneConnection) {
     EXPECT_TRUE(world.isAtRest());
 }
 
-// Goal: a status for which there is no memory is a brief one, and costs the daemon nothing. Method: the full one
-// throws.
-TEST(WantOfMemory, TheStatusIsBrief) {
-    PeerWorld world;
-    EpollRunLoop loop;
-    StatusSocket status(world.identity, loop, [](Peer&, StatusSocket::Detail detail) {
-        if (detail == StatusSocket::Detail::full)
-            throw std::bad_alloc();
-        return plist::Dictionary{{"Brief", true}};
-    });
-    ASSERT_EQ(status.open({.directory = world.test.root().runtimeDirectory(),
-                           .directoryPath = world.test.path(names::runtimeDirectory),
-                           .name = names::statusSocket}),
-              0);
-    RawClient client(world.test.path(std::string(names::runtimeDirectory) + "/" + names::statusSocket));
-    loop.post([&] { loop.stop(); });
-    loop.run();
-    const auto reply = client.receive();
-    EXPECT_TRUE(reply && reply->message.isTrue("Brief"));
-}
-
 // Goal: a handler that is about to wait while there is no memory for another thread waits all the same, and the thread
 // comes when there is. Method: the only thread waits, and a second client asks.
 TEST(WantOfMemory, AThreadComesLater) {

@@ -47,31 +47,4 @@ TEST(Value, TypedReads) {
     EXPECT_EQ(entries.string("missing"), nullptr);
 }
 
-// Goal: a description is one line of bounded length whatever the value holds. Method: a table of values and texts.
-TEST(Value, Descriptions) {
-    const struct {
-        Value value;
-        std::size_t bytesMax;
-        const char* text;
-    } rows[] = {
-        {Dictionary{{"k", Array{Value(1), Value(0.5), Value(true), Value(Date{2})}}}, 100,
-         "{\"k\" = [1, 0.5, true, date 2]}"},
-        {"a\"\\\n\r\x1B\x7F\u0085\u2028\u00E9", 100, "\"a\\\"\\\\\\n\\u000d\\u001b\\u007f\\u0085\\u2028\u00E9\""},
-        {std::string("\xFF\0", 2), 100, "\"\\xff\\u0000\""},
-        {Data{0x00, 0xAB}, 100, "<00ab>"},
-        {"0123456789", 12, "\"0123456789\""},
-        {"0123456789", 11, "\"0123456..."},
-        {"0123\u00E9", 9, "\"0123\u00E9\""},
-        {"01234\u00E9\u00E9\u00E9", 10, "\"01234..."},
-        {Data(1000000, 0xAA), 8, "<aaaa..."},
-        {"abc", 2, ".."},
-        {"abc", 0, ""},
-    };
-    for (const auto& row : rows)
-        EXPECT_EQ(describe(&row.value, row.bytesMax), row.text);
-    EXPECT_EQ(describe(nullptr), "(null)");
-    const Value deep = nestedArrays(1000);
-    EXPECT_EQ(describe(&deep), std::string(64, '[') + "[...]" + std::string(64, ']'));
-}
-
 } // namespace zor::plist::test

@@ -149,46 +149,6 @@ TEST_F(Cache, AContainerWithoutItsFileIsInconsistent) {
     EXPECT_TRUE(find("a"));
 }
 
-// Goal: each wrong input has its code and words, and touches no disk. Method: a table over the four operations.
-TEST_F(Cache, WrongInputs) {
-    const std::string identifier = "a";
-    const auto record = [](std::uint64_t containerClass) {
-        return std::make_shared<ZORMetadata>(mobile, UUID::random(), static_cast<ContainerClass>(containerClass), "a",
-                                             nullptr, ContainerPlace());
-    };
-    const auto asClass = [](std::uint64_t number) { return static_cast<ContainerClass>(number); };
-    const ContainerPlace place(world.url(applications + "/" + uuidNumber(1)));
-    const auto bundle = cache().containerForUser(mobile, asClass(1), &identifier, false);
-    const std::pair<std::string, std::string> rows[] = {
-        {complaintOf(cache().containerForUser(mobile, asClass(0), &identifier, false)), "47 Invalid Content Class: 0"},
-        {complaintOf(cache().containerForUser(mobile, asClass(14), nullptr, false)), "47 Invalid Content Class: 14"},
-        {complaintOf(cache().containerForUser(mobile, application, nullptr, false)), "47 Invalid identifier: (null)"},
-        {complaintOf(cache().allContainersForUser(mobile, asClass(14), false)), "47 Invalid Content Class: 14"},
-        {complaintOf(cache().removeContainerForUser(mobile, asClass(0), &identifier, false)),
-         "47 Invalid Content Class: 0"},
-        {complaintOf(cache().removeContainerForUser(mobile, application, nullptr, false)),
-         "47 Invalid Identifier: (null)"},
-        {complaintOf(cache().addContainerMetadata(record(0), mobile, place, false)),
-         "47 Invalid Metadata Content Class: 0"},
-        {complaintOf(cache().addContainerMetadata(record(2), mobile, ContainerPlace(), false)),
-         "47 Invalid input: URL: (null)"},
-        {complaintOf(bundle), "43 Cache: 501-Bundle/Application: Failed to rebuild"},
-        {complaintOf(cache().allContainersForUser(33, application, true)),
-         "43 Cache: 33-Data/Application(transient): Failed to rebuild"},
-        {complaintOf(cache().removeContainerForUser(0, asClass(12), &identifier, false)),
-         "43 Cache: 0-Data/System: Failed to rebuild"},
-        {complaintOf(cache().addContainerMetadata(record(2), 500, place, false)),
-         "43 Cache: 500-Data/Application: Failed to rebuild"},
-        {complaintOf(cache().containerForUser(504, application, &identifier, false)), // has no home
-         "43 Cache: 504-Data/Application: Failed to rebuild"},
-    };
-    for (const auto& [complaint, expected] : rows)
-        EXPECT_EQ(complaint, expected);
-    EXPECT_EQ(bundle.error().underlying()->text(), "ZORErrorDomain 47 \"Invalid cache get-userId 501 for class 1\"");
-    EXPECT_FALSE(world.exists(sharedPath) || world.exists(mobileContainers));
-    EXPECT_EQ(cache().counts().classCaches, 0U);
-}
-
 TEST_F(Cache, FindsByUUIDLiveBeforeTransient) {
     const std::string hex = "ABCDEF00-0000-4000-8000-00000000000A";
     put(applications, 1, "both", 11);
@@ -208,18 +168,6 @@ TEST_F(Cache, FindsByUUIDLiveBeforeTransient) {
     EXPECT_EQ(find("missing", uuidNumber(11)), nullptr);
     EXPECT_NE(find("hex", hex), nullptr);
     EXPECT_EQ(find("hex", "abcdef00-0000-4000-8000-00000000000a"), nullptr);
-}
-
-// Goal: an owner who fills the class directory fills neither memory nor log. Method: more names than are said one by
-// one.
-TEST_F(Cache, JunkIsCounted) {
-    put(applications, 1, "a", 11);
-    for (int i = 0; i < 250; ++i)
-        world.write(applications + "/junk" + std::to_string(i), "x");
-    EXPECT_EQ(all().size(), 1U);
-    const auto said = world.log.take(3, "readAndValidateMetadataAtUrl");
-    ASSERT_EQ(said.size(), 201U);
-    EXPECT_EQ(said.back(), "50 more entries of " + world.path(applications) + " are no containers");
 }
 
 // Goal: a container that cannot be looked at for want of descriptors is not taken for absent. Method: a known one,
@@ -290,30 +238,6 @@ TEST_F(Cache, AnExceptionEndsAtTheOperationAndReleasesTheLock) {
     probeThrows = true;
     EXPECT_EQ(codeOf(find("a")), ErrorCode::exceptionCaught);
     EXPECT_TRUE(find("a"));
-}
-
-// Goal: operations at once lose nothing of each other. Method: each thread must see exactly what it added.
-TEST_F(Cache, ManyThreads) {
-    world.log.setLevel(logLevelError);
-    for (int i = 0; i < 300; ++i)
-        put(applications, i, "shared" + std::to_string(i), i);
-    std::atomic<int> wrong{0};
-    inParallel(4, [&](int thread) {
-        const std::string own = "own" + std::to_string(thread);
-        for (int round = 0; round < 30; ++round) {
-            const auto record =
-                std::make_shared<ZORMetadata>(mobile, UUID::random(), application, own, nullptr, ContainerPlace());
-            wrong += !add(record, thread);
-            const auto found = find(own);
-            wrong += !found || found->get() != record.get();
-            wrong += !find("shared" + std::to_string(round));
-            wrong += round % 10 == thread && all().size() < 301;
-            wrong += !cache().removeContainerForUser(mobile, application, &own, false);
-            wrong += find(own).has_value();
-        }
-    });
-    EXPECT_EQ(wrong, 0);
-    EXPECT_EQ(cache().counts().records, 300U);
 }
 
 } // namespace

@@ -301,27 +301,6 @@ TEST_F(Create, AFailedStepLeavesNothing) {
     EXPECT_TRUE(world.names(dead).empty());
 }
 
-// Goal: an exception is error 40, anything else goes on; both clean up. Method: a throw at the last step.
-TEST_F(Create, ExceptionsCleanUp) {
-    struct NoException {};
-    (void)world.make("com.first");
-    const auto throwAtMove = [&](auto thrown) {
-        world.disk().arm({.filter = [=, done = std::make_shared<bool>(false)](const DiskCallInfo& call) {
-            if (isMove(call) && !std::exchange(*done, true))
-                throw thrown;
-            return false;
-        }});
-    };
-    throwAtMove(std::bad_alloc());
-    EXPECT_EQ(codeOf(world.create("com.example")), ErrorCode::exceptionCaught);
-    EXPECT_TRUE(world.names(staging).empty());
-    throwAtMove(NoException());
-    EXPECT_THROW((void)world.create("com.example"), NoException);
-    world.disk().disarm();
-    EXPECT_TRUE(world.names(staging).empty());
-    EXPECT_TRUE(world.create("com.example")); // the lock is free, and nothing of the container was there
-}
-
 // Goal: an identifier is made once and listed whole. Method: threads that ask for the same ones, and a lister.
 TEST_F(Create, ManyClientsAtOnce) {
     constexpr int clients = 6;

@@ -15,34 +15,6 @@ using support::LogLine;
 
 const std::string logPath = "private/var/root/Library/Logs/Zorvane/zorvaned.log";
 
-// Goal: the log's name, file and sizes by the kind of build; it goes on without. Method: a table.
-TEST(DaemonLife, OpensItsLog) {
-    struct Row {
-        bool internal;
-        int level;
-        bool opens;
-        const char* sizes;
-    };
-    for (const Row& row : {Row{false, 5, true, " 1 102400"}, Row{true, 5, true, " 4 262144"},
-                           Row{false, 7, true, " 1 102400"}, Row{false, 7, false, " 1 102400"}}) {
-        World world({.logLevel = 0});
-        world.internalBuild.internal = row.internal;
-        if (!row.opens)
-            world.log.refuseToOpen();
-        Daemon(world.services(), {.logLevel = row.level}).openLog();
-        EXPECT_EQ(world.log.openedAs(), "com.veltra.zorvaned");
-        EXPECT_EQ(world.log.diskLogging(), world.path(logPath) + row.sizes);
-        EXPECT_TRUE(world.exists(parentOf(logPath)));
-        const auto said = world.log.take();
-        ASSERT_EQ(said.empty(), row.level == 5);
-        if (!row.opens) {
-            EXPECT_EQ(said[0], (LogLine{3, "syslog", "Failed to set up rotating logs at path " + world.path(logPath)}));
-        } else if (row.level == 7) {
-            EXPECT_TRUE(said.back().message.starts_with("zorvaned built at ")) << said.back();
-        }
-    }
-}
-
 // Goal: a boot's work runs once, again without a marker; a launch's each time. Method: launches over one disk.
 TEST(DaemonLife, TheWorkOfABootRunsOnce) {
     struct Row {

@@ -61,36 +61,6 @@ TEST_F(DeathRow, APassRacesAMove) {
     }
 }
 
-// Goal: moves and passes at once lose nothing and leave nothing. Method: threads that condemn and start passes.
-TEST_F(DeathRow, ManyMovesAndPasses) {
-    std::atomic<int> failures{0};
-    inParallel(3, [&](int thread) {
-        for (int i = 0; i < 40; ++i) {
-            const std::string item = "items" + std::to_string(thread) + "/" + std::to_string(i);
-            world.makeDirectories(item);
-            failures += !condemn(item, StartDeletionThread::yes);
-            failures += world.exists(item);
-        }
-    });
-    EXPECT_EQ(failures, 0);
-    EXPECT_EQ(world.pass(), ErrorCode::success);
-    EXPECT_TRUE(world.names(dead).empty());
-    EXPECT_TRUE(world.names("tmp").empty());
-}
-
-TEST_F(DeathRow, FailingMovesAreError41) {
-    world.makeDirectories("item");
-    world.services().configuration().deathrowDirectory();
-    world.refuse(DiskCall::rename, EROFS);
-    const std::string moved = complaintOf(condemn("item", StartDeletionThread::yes));
-    EXPECT_TRUE(
-        moved.starts_with("41 Failed to move item at: " + world.path("item") + " to: " + world.path(dead) + "/temp."))
-        << moved;
-    world.refuse(DiskCall::makeDirectory, ENOSPC);
-    EXPECT_EQ(complaintOf(condemn("item")), "41 Failed to create unique directory at: " + world.path("item"));
-    EXPECT_TRUE(world.exists("item"));
-}
-
 // Goal: what cannot be removed goes to /tmp, or stays and is said; others go. Method: removal and move fail.
 TEST_F(DeathRow, WhatCannotBeRemoved) {
     world.log.setLevel(logLevelDebug);

@@ -100,37 +100,6 @@ TEST_F(Deletion, AMixedBatch) {
     EXPECT_FALSE(world.make("first").existed);
 }
 
-// Goal: unequal lists are refused before any lock, an absent user is 40 and frees it. Method: the lock is held.
-TEST_F(Deletion, ListsOfDifferentLength) {
-    const FoundContainer a = world.make("a");
-    const FoundContainer b = world.make("b");
-    {
-        const AllIdentifiersLock held(world.services().locks(), LockMode::writing);
-        Batch batches[] = {one(a), one(a), one(a)};
-        batches[0].uuids.clear();
-        batches[1].classes.clear();
-        batches[2].identifiers.clear();
-        const char* const counts[] = {"0, class count: 1, ID count: 1", "1, class count: 0, ID count: 1",
-                                      "1, class count: 1, ID count: 0"};
-        for (std::size_t i = 0; i < 3; ++i) {
-            auto answer = std::async(std::launch::async, [&] { return stageBatch(batches[i]); });
-            ASSERT_EQ(answer.wait_for(std::chrono::seconds(20)), std::future_status::ready);
-            EXPECT_EQ(complaintOf(answer.get()),
-                      std::string("11 Can't act on an invalid input: UUIDString count: ") + counts[i]);
-        }
-    }
-    EXPECT_TRUE(stageBatch({}));
-    EXPECT_TRUE(isThere(a.path));
-    Batch batch = one(a);
-    for (const auto& uuid : {b.uuid, UUID::random()})
-        add(batch, mobile, uuid, "b", 2);
-    batch.users.resize(1);
-    EXPECT_EQ(codeOf(stageBatch(batch)), ErrorCode::exceptionCaught);
-    EXPECT_FALSE(isThere(a.path));
-    EXPECT_TRUE(isThere(b.path));
-    EXPECT_TRUE(world.make("b").existed); // no lock is left behind
-}
-
 // Goal: mappings go with per-user classes, entitlements and children with bundles. Method: every class with both.
 TEST_F(Deletion, WhatGoesWithEachClass) {
     const std::string own = "own";

@@ -215,33 +215,5 @@ TEST_F(Shared, PeersRegisterThemselves) {
     EXPECT_TRUE(mapping().identifierHasCallerRegisteredEntitlements("late"));
 }
 
-// Goal: one identity on many connections is registered once. Method: threads with a connection each.
-TEST_F(Shared, OneIdentityOnManyConnections) {
-    std::atomic<std::size_t> writes{0};
-    world.disk().arm({.filter = [&](const DiskCallInfo& call) {
-        writes += call.subject.ends_with("-> zor_entitlements.plist");
-        return false;
-    }});
-    constexpr int connections = 4;
-    constexpr int messages = 20;
-    std::atomic<int> served{0};
-    inParallel(connections, [&](int) {
-        FakeConnection own;
-        own.peer_.identity = {
-            .pid = peerPid, .effectiveUserId = mobile, .grant = grant("app", Dictionary{{appGroups, Array{"g"}}})};
-        for (int i = 0; i < messages; ++i) {
-            const auto channel = std::make_shared<FakeReply>();
-            platform::ServiceEvent event{.kind = platform::ServiceEvent::Kind::message,
-                                         .request = {{"Command", 13}, {"UserID", 1}},
-                                         .reply = channel};
-            world.services().dispatcher().ZORProcessIpsiEvent(own, event);
-            served += channel->replies().size() == 1 && groupsIn(channel->replies()[0]).contains("g");
-        }
-    });
-    world.disk().disarm();
-    EXPECT_EQ(served, connections * messages);
-    EXPECT_EQ(writes, 1U);
-}
-
 } // namespace
 } // namespace zor::test

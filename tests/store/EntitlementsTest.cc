@@ -218,22 +218,6 @@ TEST(EntitlementMapping, AnUnreadableFileThatCannotBeMoved) {
     EXPECT_TRUE(world.services().entitlements().entitlementsExistForIdentifier("b"));
 }
 
-// Goal: an identifier is well known in its own class alone, and in its own letters. Method: every class.
-TEST(Whitelist, BuiltInTables) {
-    World world;
-    const ZORWhitelist& table = world.services().whitelist();
-    for (std::uint64_t number = 0; number <= 14; ++number) {
-        const auto containerClass = static_cast<ContainerClass>(number);
-        EXPECT_EQ(table.containerIdIsWellknown("com.veltra.settingsd", containerClass), number == 12);
-        for (const char* group : {"certificates", "dictionaries", "fonts", "timezone"})
-            EXPECT_EQ(table.containerIdIsWellknown(std::string("systemgroup.com.veltra.") + group, containerClass),
-                      number == 13);
-        EXPECT_EQ(table.wellknownContainerForId("com.veltra.settingsd", containerClass) != nullptr, number == 12);
-        EXPECT_EQ(table.directoryNameIsWellknown("com.veltra.settingsd", containerClass), number == 12);
-        EXPECT_FALSE(table.containerIdIsWellknown("COM.VELTRA.SETTINGSD", containerClass));
-    }
-}
-
 // Goal: the file's table stands for the built-in one, but for rows that lead elsewhere. Method: rows, then bad files.
 TEST(Whitelist, TheTableFile) {
     World world;

@@ -63,41 +63,6 @@ TEST(Layout, TheInstallersHomeIsNotMade) {
         << said[2];
 }
 
-// Goal: which users and classes have no place, and what is said each time. Method: a table; nothing is made.
-TEST(Layout, PlacesThatDoNotExist) {
-    struct Row {
-        std::uint32_t userId;
-        std::uint64_t containerClass;
-        std::vector<LogLine> lines;
-    };
-    const auto noClass = [](const char* number) {
-        return LogLine{3, "containerDirectoryURLForContentClass",
-                       std::string("Invalid class for a per user container directory: ") + number};
-    };
-    const auto inInit = [](const char* message) { return LogLine{3, "initWithUserId", message}; };
-    World world;
-    const Row rows[] = {
-        {mobile, 0, {inInit(("user home Dir: " + world.path("private/var/mobile")).c_str()), noClass("0")}},
-        {mobile, 14, {noClass("14")}},
-        {33, 2, {inInit("userId: 33 must be in range")}},
-        {33, 2, {inInit("userId: 33 must be in range")}},
-        {500, 0, {inInit("userId: 500 must be in range")}},
-        {511, 2, {inInit("userId: 511 must be in range")}},
-        {504, 2, {inInit("Failed to getpwuid for uid: 504"), inInit("user home Dir: (null)")}},
-        {504, 2, {}},
-    };
-    ZORGlobalConfiguration& configuration = world.services().configuration();
-    for (const Row& row : rows) {
-        EXPECT_FALSE(configuration.containerDirectoryURLForUser(
-            row.userId, static_cast<ContainerClass>(row.containerClass), false));
-        EXPECT_EQ(world.log.take(), row.lines) << row.userId;
-    }
-    for (const std::uint32_t userId : {501, 502, 503, 504})
-        EXPECT_EQ(configuration.getPerUserConfigurationForUserId(userId)->existsUserBaseDirectory(), userId <= second);
-    EXPECT_FALSE(world.exists(mobileContainers));
-    EXPECT_FALSE(world.exists("private/var/nowhere"));
-}
-
 // Goal: a home may be the administrator's link; below it a user's leads nowhere. Method: both kinds.
 TEST(Layout, LinksToAndBelowAHome) {
     World world;

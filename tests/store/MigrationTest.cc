@@ -154,30 +154,6 @@ TEST(Migration, AMarkerThatCannotBeExamined) {
     EXPECT_TRUE(world.exists(former + "/Application/" + firstUuid));
 }
 
-// Goal: a failure has its code, and no marker keeps the next boot from it. Method: a disk that fails one kind of call.
-TEST(Migration, BundleFailures) {
-    for (const auto& [call, succeeds, code] :
-         {std::tuple(DiskCall::rename, false, static_cast<ErrorCode>(-EROFS)),
-          std::tuple(DiskCall::createFile, true, ErrorCode::propertyListNotWritten)}) {
-        SCOPED_TRACE(support::nameOf(call));
-        World world;
-        putFormerBundle(world, former + "/Application/" + firstUuid, "a");
-        world.services().configuration().bundleDirectory();
-        world.services().configuration().libraryDirectory();
-        world.load();
-        world.refuse(call, EROFS, FaultSpan::fromThenOn);
-        const auto outcome = world.services().store().migrator.performMigrationWithError();
-        world.disk().disarm();
-        EXPECT_EQ(outcome.succeeded, succeeds);
-        ASSERT_TRUE(outcome.error);
-        EXPECT_EQ(codeOf(*outcome.error), code);
-        EXPECT_FALSE(world.exists(bundleMarker));
-        world.restart();
-        EXPECT_TRUE(migrateBundles(world).succeeded); // the next boot
-        EXPECT_TRUE(world.exists(bundleMarker));
-    }
-}
-
 // Goal: well-known containers move to their names, once; a taken name stops it. Method: both classes, twice.
 TEST(Migration, WellknownContainers) {
     World world;

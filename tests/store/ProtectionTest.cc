@@ -333,28 +333,6 @@ TEST_F(Protection, HostileOwner) {
     EXPECT_FALSE(world.exists(path + "tmp")); // an item that is missing is not made
 }
 
-// Goal: a refused set ends the change unrecorded; a descriptor gone bad is passed over. Method: a failing disk.
-TEST_F(Protection, FailuresOfTheSystem) {
-    put("Documents/file", 4);
-    const auto says = [&](const char* part) {
-        return std::ranges::any_of(world.log.take(),
-                                   [&](const auto& one) { return one.message.find(part) != std::string::npos; });
-    };
-    for (const auto& [error, code, line] :
-         {std::tuple(ENOSPC, std::uint64_t{ENOSPC}, "failed with error"), std::tuple(EPERM, std::uint64_t{EACCES}, ""),
-          std::tuple(EBADF, std::uint64_t{1}, "Ignoring failure")}) {
-        world.refuse(DiskCall::setAttribute, error, FaultSpan::fromThenOn);
-        EXPECT_EQ(change(to(1)), code);
-        world.disk().disarm();
-        EXPECT_EQ(recorded().has_value(), code == 1);
-        EXPECT_TRUE(says(line)) << line;
-    }
-    // What is set and cannot be recorded is set.
-    world.refuse(DiskCall::createFile, ENOSPC, FaultSpan::fromThenOn);
-    EXPECT_EQ(change(to(3)), 1U);
-    EXPECT_TRUE(says("Failed to set protection class info for "));
-}
-
 /// Refuses every open of a file or directory, as one whom root lets watch it may.
 class OpenRefusal {
 public:

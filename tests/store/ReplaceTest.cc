@@ -192,36 +192,6 @@ TEST_F(Replace, AFailedStepLeavesWhatItMust) {
         }
 }
 
-// Goal: wherever the library throws: error 40, no lock, one whole container. Method: a throw at each call in turn.
-TEST_F(Replace, AnExceptionAnywhereIsAnError) {
-    bool threw = true;
-    for (int point = 1; threw; ++point) {
-        SCOPED_TRACE(point);
-        ASSERT_LT(point, 200);
-        const std::string identifier = "com.example." + std::to_string(point);
-        const FoundContainer old = make(identifier, false);
-        const FoundContainer fresh = make(identifier, asTransient);
-        int calls = 0;
-        world.disk().arm({.filter = [&](const DiskCallInfo&) -> bool {
-            if (++calls == point)
-                throw std::runtime_error("thrown by the test");
-            return false;
-        }});
-        const auto replaced = replace(swap(&old, fresh));
-        world.disk().disarm();
-        threw = calls >= point;
-        EXPECT_EQ(codeOf(replaced), threw ? ErrorCode::exceptionCaught : ErrorCode::success);
-        EXPECT_EQ(world.services().locks().identifiersInUse(), 0U);
-        const bool wasThere = world.find(identifier).has_value();
-        relaunch();
-        const auto found = world.find(identifier);
-        EXPECT_EQ(found.has_value(), wasThere);
-        EXPECT_TRUE(found || isThere(fresh.path));
-        EXPECT_FALSE(found && contentOf(*found).empty());
-        EXPECT_TRUE(isQuiet());
-    }
-}
-
 // Goal: want of descriptors loses nothing and brings nothing back. Method: each number of them, deletion, launch.
 TEST_F(Replace, WantOfDescriptorsNeitherLosesNorBringsBack) {
     const std::string identifier = "short";

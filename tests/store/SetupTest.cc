@@ -138,30 +138,6 @@ TEST(Setup, ATableThatCannotBeReadDeletesNothing) {
     }
 }
 
-TEST(Setup, AnInternalBuildShowsWhatItDeletes) {
-    World world;
-    world.internalBuild.internal = true;
-    world.write(applications + "/Junk/file", "x");
-    world.load();
-    world.log.take();
-    world.daemonsClient()._cleanupOrphanedDataForUser(mobile, application);
-    const std::string orphan = "\tOrphaned File: " + world.path(applications + "/Junk");
-    auto said = world.log.take();
-    ASSERT_EQ(said.size(), 6U);
-    said.erase(said.begin());
-    EXPECT_EQ(said, (std::vector<LogLine>{
-                        {3, cleanup,
-                         "***INTERNAL BUILD REQUEST: If you see this, file a Tracklet in \"Zorvane | all\" with "
-                         "the following data:"},
-                        {3, cleanup,
-                         "\tSomeone is writing invalid data to a container, which has now been orphaned. Here "
-                         "are the invalid files:"},
-                        {3, "printDirectoryStructureAtURL", orphan},
-                        {3, "printDirectoryStructureAtURL", orphan + "/file"},
-                        {3, cleanup, "***END INTERNAL BUILD REQUEST"}}));
-    EXPECT_FALSE(world.exists(applications + "/Junk"));
-}
-
 // Goal: a boot throws transient containers away, a launch empties staging and death row and forgets what it found.
 // Method: containers of every kind before, a boot, a launch.
 TEST(Setup, BootAndLaunch) {

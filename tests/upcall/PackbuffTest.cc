@@ -74,40 +74,6 @@ TEST(Packbuff, WritesByteForByte) {
     }
 }
 
-// Goal: a writer grows by its step and by what is needed, no more. Method: sizes after each write, against a table.
-TEST(Packbuff, GrowsByItsStep) {
-    struct Row {
-        std::uint32_t blockSize;
-        std::vector<std::uint32_t> lengths; // of bytes items
-        std::vector<std::uint32_t> allocated;
-    };
-    const std::string data(1000, 'x');
-    const Row rows[] = {
-        {0, {}, {256}},
-        {7, {}, {256}},
-        {8, {0, 0}, {8, 16, 24}},
-        {12, {0, 0}, {12, 24, 24}},
-        {256, {240, 0, 1000}, {256, 256, 512, 512 + 256 + 1008}},
-        {256, {241}, {256, 256 + 256 + 0}},
-        {16, {100}, {16, 16 + 16 + 112}},
-    };
-    for (const Row& row : rows) {
-        SCOPED_TRACE(row.blockSize);
-        const PackbuffPointer packbuff(sb_packbuff_new(row.blockSize));
-        ASSERT_TRUE(packbuff);
-        std::vector<std::uint32_t> allocated{packbuff->bytes_allocated};
-        std::uint32_t used = 8;
-        for (const std::uint32_t length : row.lengths) {
-            EXPECT_EQ(sb_packbuff_pack_bytes(packbuff.get(), 1, data.data(), length), packbuffSuccess);
-            used += 8 + (length + 7) / 8 * 8;
-            EXPECT_EQ(packbuff->bytes_used, used);
-            EXPECT_EQ(packbuff->bytes_remaining, packbuff->bytes_allocated - used);
-            allocated.push_back(packbuff->bytes_allocated);
-        }
-        EXPECT_EQ(allocated, row.allocated);
-    }
-}
-
 // Goal: what cannot be written is refused with its code and changes nothing. Method: a table over one writer.
 TEST(Packbuff, RefusesWhatItCannotWrite) {
     const std::pair<Write, int> rows[] = {
@@ -264,35 +230,6 @@ TEST(Packbuff, StaysInsideDamagedBytes) {
             damaged[at] = static_cast<std::uint8_t>(value);
             drive(damaged);
         }
-}
-
-// Goal: the dump has these words. Method: whole dumps, addresses taken out.
-TEST(Packbuff, PrintsItsItems) {
-    const auto head = [](const std::string& block, const std::string& dealloc, const std::string& allocated,
-                         const std::string& used, const std::string& remaining) {
-        return "packbuff: ADDRESS\n  block_size:      " + block + "\n  dealloc_type:    " + dealloc +
-               "\n  bytes_allocated: " + allocated + "\n  bytes_used:      " + used +
-               "\n  bytes_remaining: " + remaining + "\n  item_buffer ADDRESS, item: ADDRESS\n\n";
-    };
-    const PackbuffPointer packbuff(sb_packbuff_new(64));
-    sb_packbuff_pack_uint32(packbuff.get(), 3, 501);
-    sb_packbuff_pack_string(packbuff.get(), 4, "ab", 2);
-    sb_packbuff_pack_bytes(packbuff.get(), 5, "xyz", 3);
-    EXPECT_EQ(withoutAddresses(printed(packbuff.get())),
-              head("64", "free()", "64", "48", "16") +
-                  "   0:ADDRESS -- value type 3 --inline value: 501\n"
-                  "   1:ADDRESS -- value type 4 --string (ADDRESS, 5 pad bytes, size: 3): \n     `ab'\n"
-                  "   2:ADDRESS -- value type 5 --bytes (ADDRESS, 5 pad bytes, size: 3)\n"
-                  "*  3: ADDRESS -- END\n");
-    ByteVector bytes = fromHex("09 00 01 00 08 00 00 00  02 00 01 00 20 00 00 00  61 62 63 64 65 66 67 68");
-    for (const auto& [type, name] : {std::pair{0U, "None"}, {7U, "<Unknown>"}}) {
-        const PackbuffPointer reader(sb_packbuff_init_with_buffer(bytes.data(), bytes.size(), true, type));
-        EXPECT_EQ(withoutAddresses(printed(reader.get())),
-                  head("0", name, "24", "24", "0") +
-                      "*  0:ADDRESS -- value type 1 --*Unknown item type* 9\n"
-                      "   1:ADDRESS -- value type 1 --string (ADDRESS, 0 pad bytes, size: 32): \n     `abcdefgh'\n"
-                      ">> item pointer exceeds end of buffer. <<");
-    }
 }
 
 // Goal: each kind of buffer is released once, as it was got. Method: pages that are looked for afterwards, pages that

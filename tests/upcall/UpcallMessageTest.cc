@@ -70,46 +70,5 @@ TEST(UpcallMessage, TakesOnlyARepliesForm) {
     }
 }
 
-// Goal: what does not fit is said in these words, the status tells it, and nothing comes after it. Method: the golden
-// containers packed into buffers of every size that cannot grow.
-TEST(UpcallMessage, AReplyThatDoesNotFitSaysSo) {
-    const ProcessContainers containers = goldenContainers();
-    const std::string path = "sb_packbuff_pack_string() fails: 45; type: ";
-    const std::string pair = "sb_packbuff_pack_key_with_string_value() fails: 45; group ID: ";
-    const std::string group = pair + "group.a, group container: " + containers.appGroups->at("group.a");
-    const std::string systemGroup = pair + "sg, system group container: " + containers.systemGroups->at("sg");
-    // What is said when so many items could be packed.
-    const std::vector<std::vector<std::string>> linesAfter = {{path + "100, path: " + *containers.homeDirectory},
-                                                              {path + "1, path: " + *containers.dataContainer},
-                                                              {path + "2, path: " + *containers.temporaryDirectory},
-                                                              {group},
-                                                              {group},
-                                                              {systemGroup},
-                                                              {systemGroup},
-                                                              {}};
-    support::RecordingLog lines(logLevelNotice);
-    const Log log(lines);
-    const std::size_t whole = golden("reply.hex").size() - ReplyOffset::buffer;
-    for (std::size_t size = 8; size <= whole; ++size) {
-        SCOPED_TRACE(size);
-        ByteVector memory(size);
-        const PackbuffPointer packbuff(sb_packbuff_init_with_buffer(memory.data(), size, false, packbuffDeallocNone));
-        packProcessContainersReply(log, *packbuff, containers, true);
-        const std::span packed(sb_packbuff_get_bytes(packbuff.get()), sb_packbuff_get_size(packbuff.get()));
-        UpcallReply reply = replyIn(encodeReply(processContainersMessageId, packed));
-        std::vector<std::string> said = lines.take(logLevelError, "server_get_process_containers");
-        const bool hasStatus = !reply.items.empty() && reply.items.back().first == CM_KERN_REPLY_STATUS;
-        if (hasStatus) {
-            reply.items.pop_back();
-        } else {
-            ASSERT_FALSE(said.empty());
-            EXPECT_TRUE(said.back().starts_with("sb_packbuff_pack_uint32() fails: 45; type: 0, value: "));
-            said.pop_back();
-        }
-        EXPECT_EQ(said, linesAfter.at(reply.items.size()));
-        EXPECT_EQ(reply.items.size() == 7 && hasStatus, size == whole);
-    }
-}
-
 } // namespace
 } // namespace zor::test
