@@ -8,7 +8,11 @@
 #include <fcntl.h>
 #include <filesystem>
 #include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/epoll.h>
 #include <sys/file.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
 #include <thread>
 
 namespace zor::whole {
@@ -182,12 +186,14 @@ TEST(Run, CommandLines) {
         {withUser("501x"), 125, "'501x' is no user"},
         {withUser("4294967295"), 125, "is no user"},
         {withUser("4294967797"), 125, "is no user"},
+        {{"--network", "lan", "sh"}, 125, "is no network"},
         {{"--identifier", "a.b", "--user", "501", "--"}, 125, "no program"},
         {{"--identifier", "a.b", "--user", "501", ""}, 125, "no program"},
         {{"--identifier", "a.b", "--user"}, 125, "needs a value"},
         {{"--nothing", "sh"}, 125, "is no option"},
         {{"--inside"}, 125, "itself"},
-        {{"--inside", "0", "0", "/", "sh"}, 125, "itself"},
+        {{"--inside", "0", "0", "none", "/", "sh"}, 125, "itself"},
+        {{"--inside", "0", "501", "lan", "/", "sh"}, 125, "itself"},
         {{"--identifier", "a.b", "--user", "501", "--root", "/nowhere", "sh"}, 125, "What to do: "},
         {{"--identifier", "a.b", "--user", "501", "--root", empty.path(), "sh", "--user"}, 125, "What to do: "},
     };
@@ -252,6 +258,11 @@ TEST(Run, ItsOwnContainersAndNothingElse) {
         "grep -qx 'NoNewPrivs:\t1' /proc/self/status",
         "test \"$(grep -c '^Cap.*:\t0000000000000000$' /proc/self/status)\" = 5",
         "grep -qx 'SigBlk:\t0000000000000000' /proc/self/status",
+        "grep -qx 'SigIgn:\t0000000000000000' /proc/self/status && test $(umask) = 0022",
+        // Ways to powers, and to what is the same in all namespaces.
+        "grep -qx 'Seccomp:\t2' /proc/self/status && ! unshare -Ur true && ! cat /proc/keys",
+        "test \"$(grep -c : /proc/net/dev)\" = 1 && test $(wc -l < /proc/net/unix) = 1",
+        "test $(stat -f -c %c /tmp) -le 16384 && test $(stat -f -c %c /dev/shm) -le 16384",
         "test -z \"$ZORVANE_TEST_SECRET\" && test \"$LC_ALL\" = C.UTF-8",
         // Of descriptors, the shell has the three; the fourth is what ls reads with.
         "test \"$(ls /proc/self/fd | tr '\\n' ' ')\" = '0 1 2 3 '",
@@ -260,15 +271,19 @@ TEST(Run, ItsOwnContainersAndNothingElse) {
     ::setenv("ZORVANE_TEST_SECRET", "secret", 1);
     ::setenv("LC_ALL", "C.UTF-8", 1);
     const int inherited = ::open("/", O_PATH | O_DIRECTORY); // a way out, were it passed on
+    const mode_t mask = ::umask(0);
+    ::signal(SIGPIPE, SIG_IGN);
     std::string script;
     for (const std::string& condition : conditions)
         script += "{ " + condition + "; } >$TMPDIR/out 2>&1 || cat <<'END'\nfailed: " + condition + "\nEND\n";
-    for (const char* space : {"pid", "ipc", "mnt", "uts"}) {
+    for (const char* space : {"pid", "ipc", "mnt", "uts", "net"}) {
         const std::string link = std::string("/proc/self/ns/") + space;
         script += "test \"$(readlink " + link + ")\" != '" + files::read_symlink(link).string() + "' || echo shares " +
                   space + "\n";
     }
     const auto outcome = launcher.shell(notes, script + "exit 0");
+    ::signal(SIGPIPE, SIG_DFL);
+    ::umask(mask);
     ::close(inherited);
     ::unsetenv("ZORVANE_TEST_SECRET");
     EXPECT_EQ(outcome.exitStatus, 0);
@@ -343,15 +358,99 @@ TEST(Run, ExitCodesAndSignals) {
     const std::string maker = launcher.daemon.path("maker");
     writeFile(maker, "#!/bin/sh\ntouch " + ready + "\nsleep 0.3\nexec /usr/bin/bwrap \"$@\"\n", 0755);
     EXPECT_EQ(signalled({"--bubblewrap", maker, "--", "sleep", "60"}, SIGTERM).exitStatus, 128 + SIGTERM);
-    // A lock that only the program holds is free again when the launcher was killed.
-    files::remove(ready);
-    Program run(launcher.words(notes, {"--", "sh", "-c", "exec 9>$HOME/held; flock 9; " + wait}));
-    ASSERT_TRUE(waitUntil([&] { return files::exists(ready); }));
-    const Words free = {"/usr/bin/flock", "-n", launcher.data(notes) + "/held", "true"};
-    ASSERT_NE(runProgram(free).exitStatus, 0);
-    run.signal(SIGKILL);
-    EXPECT_EQ(run.wait(), 128 + SIGKILL);
-    EXPECT_TRUE(waitUntil([&] { return runProgram(free).exitStatus == 0; }));
+}
+
+// Goal: at whatever moment the launcher is killed, nothing that it started is left. Method: a pipe that all of them
+// hold open ends; the launcher is killed at many moments of its beginning, and with a maker that has children and sees
+// to nothing.
+TEST(Run, NothingOutlivesTheLauncher) {
+    ZOR_NEEDS_SANDBOX();
+    Launcher launcher;
+    const std::string ready = launcher.data(notes) + "/ready";
+    const std::string maker = launcher.daemon.path("maker");
+    writeFile(maker, "#!/bin/sh\nsetsid sleep 60 &\ntouch " + ready + "\nsleep 60\n", 0755);
+    constexpr int moments = 60;
+    for (int moment = 0; moment < moments + 2; ++moment) {
+        SCOPED_TRACE(moment);
+        Words words = {"--", "sh", "-c", "touch $HOME/ready; sleep 60"};
+        if (moment == moments)
+            words.insert(words.begin(), {"--bubblewrap", maker});
+        int ends[2] = {};
+        ASSERT_EQ(::pipe2(ends, O_CLOEXEC), 0);
+        files::remove(ready);
+        Program run(launcher.words(notes, words), [&] { return ::dup2(ends[1], STDOUT_FILENO) == 1; });
+        ::close(ends[1]);
+        if (moment < moments)
+            std::this_thread::sleep_for(std::chrono::microseconds(400 * moment));
+        else
+            EXPECT_TRUE(waitUntil([&] { return files::exists(ready); }));
+        run.signal(SIGKILL);
+        EXPECT_EQ(run.wait(), 128 + SIGKILL);
+        pollfd end{.fd = ends[0], .events = 0, .revents = 0};
+        EXPECT_EQ(::poll(&end, 1, 10'000), 1) << "somebody still holds the caller's pipe";
+        ::close(ends[0]);
+    }
+}
+
+// Goal: no standard descriptor leads out of the sandbox. Method: a table of what a caller may give as standard input,
+// without and with the host's network; a directory also as standard output.
+TEST(Run, StandardDescriptorsLeadNowhere) {
+    ZOR_NEEDS_SANDBOX();
+    Launcher launcher;
+    const auto socket = [](int domain, int type) {
+        int pair[2] = {::socket(domain, type & 0xFF, 0), -1};
+        if ((type & 0x100) != 0)
+            (void)!::socketpair(domain, type & 0xFF, 0, pair);
+        return pair[0];
+    };
+    constexpr int connected = 0x100;
+    const struct {
+        const char* what;
+        std::function<int()> open;
+        int exitCodes[2]; // without the host's network, with it
+    } rows[] = {
+        {"a directory", [] { return ::open("/etc", O_RDONLY); }, {125, 125}},
+        {"a place", [] { return ::open("/etc", O_PATH); }, {125, 125}},
+        {"a file's place", [] { return ::open("/etc/passwd", O_PATH); }, {125, 125}},
+        {"an epoll", [] { return ::epoll_create1(0); }, {125, 125}},
+        {"datagrams", [&] { return socket(AF_UNIX, SOCK_DGRAM); }, {125, 0}},
+        {"connected datagrams", [&] { return socket(AF_UNIX, SOCK_DGRAM | connected); }, {125, 0}},
+        {"a socket of no peer", [&] { return socket(AF_UNIX, SOCK_STREAM); }, {125, 0}},
+        {"a socket of the network", [&] { return socket(AF_INET, SOCK_STREAM); }, {125, 0}},
+        {"a stream", [&] { return socket(AF_UNIX, SOCK_STREAM | connected); }, {0, 0}},
+        {"a file", [] { return ::open("/etc/passwd", O_RDONLY); }, {0, 0}},
+    };
+    for (const auto& row : rows)
+        for (const bool host : {false, true}) {
+            Program run(launcher.words(notes, {"--network", host ? "host" : "none", "--", "true"}),
+                        [&] { return ::dup2(row.open(), STDIN_FILENO) == 0; });
+            EXPECT_EQ(run.wait(), row.exitCodes[host ? 1 : 0]) << row.what << ": " << run.said();
+        }
+    Program run(launcher.words(notes, {"--", "true"}),
+                [] { return ::dup2(::open("/", O_RDONLY), STDOUT_FILENO) == 1; });
+    EXPECT_EQ(run.wait(), 125);
+    EXPECT_NE(run.said().find("standard output is a directory"), std::string::npos) << run.said();
+    EXPECT_EQ(launcher.run(notes, {"--network", "host", "--", "readlink", "/proc/self/ns/net"}).output,
+              files::read_symlink("/proc/self/ns/net").string() + "\n");
+}
+
+// Goal: a container that only this process does not see is not taken for one that is gone. Method: a mount namespace
+// that hides the homes, as a unit may ask for.
+TEST(Run, HomesThatTheUnitHides) {
+    ZOR_NEEDS_SANDBOX();
+    const Launcher launcher;
+    Words words = {"/usr/bin/unshare",
+                   "-m",
+                   "sh",
+                   "-c",
+                   "mount -t tmpfs none " + launcher.daemon.path("private/var/mobile") + " && exec \"$@\"",
+                   "sh"};
+    const Words run = launcher.words(notes, {"--", "true"});
+    words.insert(words.end(), run.begin(), run.end());
+    const auto outcome = runProgram(words);
+    EXPECT_EQ(outcome.exitStatus, 125);
+    EXPECT_NE(outcome.output.find("the mount namespace of this process"), std::string::npos) << outcome.output;
+    EXPECT_EQ(outcome.output.find("delete"), std::string::npos) << outcome.output;
 }
 
 // Goal: nothing is used that is not registered, and the error says how to register it. Method: a table of choices, the

@@ -7,12 +7,63 @@
 #include <fcntl.h>
 #include <linux/close_range.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
 namespace zorvanerun {
 
 using zor::platform::FileDescriptor;
+
+namespace {
+
+/// Whether it can reach one peer and no other. One of the network can be connected anew, and so can datagrams.
+bool isBoundToOnePeer(int socket) {
+    const auto option = [&](int name) {
+        int value = -1;
+        socklen_t length = sizeof value;
+        return ::getsockopt(socket, SOL_SOCKET, name, &value, &length) == 0 ? value : -1;
+    };
+    sockaddr_storage peer{};
+    socklen_t length = sizeof peer;
+    const int type = option(SO_TYPE);
+    return option(SO_DOMAIN) == AF_UNIX && (type == SOCK_STREAM || type == SOCK_SEQPACKET) &&
+           ::getpeername(socket, reinterpret_cast<sockaddr*>(&peer), &length) == 0;
+}
+
+/// nullptr when it leads nowhere.
+const char* whyRefused(int fd, Network network) {
+    struct stat status{};
+    const int flags = ::fcntl(fd, F_GETFL);
+    if (flags < 0 || ::fstat(fd, &status) != 0)
+        return "cannot be examined";
+    if ((flags & O_PATH) != 0)
+        return "is a place and not open for reading or writing";
+    switch (status.st_mode & S_IFMT) {
+    case S_IFREG:
+    case S_IFIFO:
+    case S_IFCHR:
+    case S_IFBLK:
+        return nullptr;
+    case S_IFSOCK:
+        return network == Network::host || isBoundToOnePeer(fd) ? nullptr
+                                                                : "is a socket that reaches the host's network";
+    case S_IFDIR:
+        return "is a directory";
+    default:
+        return "is neither file, pipe, terminal nor socket";
+    }
+}
+
+} // namespace
+
+std::string whyStandardDescriptorRefused(Network network) {
+    constexpr const char* names[] = {"input", "output", "error"};
+    for (int fd = STDIN_FILENO; fd <= STDERR_FILENO; ++fd)
+        if (const char* why = whyRefused(fd, network))
+            return std::string("standard ") + names[fd] + " " + why;
+    return {};
+}
 
 bool closeOnExecFrom(int first) {
     return ::syscall(SYS_close_range, static_cast<unsigned>(first), UINT_MAX, CLOSE_RANGE_CLOEXEC) == 0;

@@ -1,10 +1,17 @@
 // SPDX-License-Identifier: Apache-2.0
-// What is done with descriptors around an execution: closed, kept, passed over a socket.
+// What is done with descriptors around an execution: judged, closed, kept, passed over a socket.
 #pragma once
 
+#include "Options.h"
 #include "platform/FileDescriptor.h"
 
+#include <string>
+
 namespace zorvanerun {
+
+/// Why one of the first three descriptors would lead a program out of its sandbox; empty when none does. A directory
+/// leads to all around it, and a socket of the host's network that is not bound to one peer leads there.
+[[nodiscard]] std::string whyStandardDescriptorRefused(Network network);
 
 /// Every descriptor from `first` on closes when a program is executed.
 [[nodiscard]] bool closeOnExecFrom(int first);

@@ -3,6 +3,7 @@
 
 #include "Descriptors.h"
 #include "Failure.h"
+#include "Fence.h"
 
 #include <cerrno>
 #include <charconv>
@@ -13,7 +14,9 @@
 #include <fcntl.h>
 #include <grp.h>
 #include <linux/capability.h>
+#include <optional>
 #include <sys/prctl.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
@@ -21,7 +24,10 @@ namespace zorvanerun {
 
 namespace {
 
-enum Argument : int { optionAt = 1, channelAt, userAt, directoryAt, programAt };
+/// Only its owner may change what a program makes.
+constexpr mode_t usualUmask = 022;
+
+enum Argument : int { optionAt = 1, channelAt, userAt, networkAt, directoryAt, programAt };
 
 int say(const std::string& what, int exitCode) {
     std::fprintf(stderr, "zorvane-run: %s\n", printable(what).c_str());
@@ -75,28 +81,42 @@ bool become(uid_t user) {
            ::setresuid(user, user, user) == 0 && dropCapabilities() && hasNothingLeft(user);
 }
 
+/// A caller that ignores a signal, or has it blocked, means itself.
+void takeSignals() {
+    for (int number = 1; number <= SIGRTMAX; ++number)
+        (void)::signal(number, SIG_DFL); // two have no other effect than their own, and say so
+    sigset_t none;
+    ::sigemptyset(&none);
+    ::sigprocmask(SIG_SETMASK, &none, nullptr);
+}
+
 } // namespace
 
 int runInside(int argumentCount, char** arguments) {
     int channel = -1;
     std::uint32_t user = 0;
+    std::optional<Network> network;
     if (argumentCount <= Argument::programAt || !parse(arguments[Argument::channelAt], channel) || channel < 0 ||
-        !parse(arguments[Argument::userAt], user) || user == 0)
+        !parse(arguments[Argument::userAt], user) || user == 0 ||
+        !(network = networkNamed(arguments[Argument::networkAt])))
         return say("the option is for the use of zorvane-run itself", exitFailure);
+    if (!leaveKeys())
+        return say(withReason("cannot leave the caller's keys", errno), exitFailure);
     if (!become(user))
         return say(withReason("cannot become user " + std::to_string(user), errno), exitFailure);
     // As the user: a container may be closed to everybody else.
     const char* const directory = arguments[Argument::directoryAt];
     if (::chdir(directory) != 0)
         return say(withReason("cannot go to " + std::string(directory), errno), exitFailure);
-    sigset_t none;
-    ::sigemptyset(&none);
-    ::sigprocmask(SIG_SETMASK, &none, nullptr);
+    ::umask(usualUmask);
+    takeSignals();
     const zor::platform::FileDescriptor self(static_cast<int>(::syscall(SYS_pidfd_open, ::getpid(), 0)));
     if (!self.valid() || !sendDescriptor(channel, self.get()))
         return say(withReason("cannot report", errno), exitFailure);
     if (!closeOnExecFrom(STDERR_FILENO + 1))
         return say(withReason("cannot close descriptors", errno), exitFailure);
+    if (!fence(*network))
+        return say(withReason("the kernel does not take the rules for system calls", errno), exitFailure);
     char** const program = arguments + Argument::programAt;
     ::execvp(program[0], program);
     const int number = errno;

@@ -29,15 +29,30 @@ std::unexpected<Failure> failed(std::string what, std::string advice) {
     return std::unexpected(Failure{.what = std::move(what), .advice = std::move(advice)});
 }
 
-Result<FileDescriptor> openPlain(const Root& root, const std::string& path, const std::string& what,
-                                 const std::string& advice) {
+/// Why a container is not found at the place that the daemon has just told.
+Failure notFound(const std::string& cannot, const std::string& path, const std::string& advice) {
+    constexpr const char* unit = "start this program where the directory is seen: of its unit, take away ProtectHome=, "
+                                 "InaccessiblePaths=, TemporaryFileSystem= or RootDirectory= (the sandbox shows the "
+                                 "program no more than is its own)";
+    // What process 1 sees is what is there for all; looking takes a power that the unit may lack.
+    const FileDescriptor all(::open("/proc/1/root", O_PATH | O_DIRECTORY | O_CLOEXEC));
+    if (!all.valid())
+        return {.what = cannot + ". The daemon finds it: does the mount namespace of this process hide it",
+                .advice = std::string(unit) + "; if no unit hides it, " + advice};
+    if (openBeneath(all.get(), path.c_str() + 1, O_PATH | O_DIRECTORY))
+        return {.what = cannot + ". It is there, but the mount namespace of this process hides it", .advice = unit};
+    return {.what = cannot, .advice = advice};
+}
+
+std::expected<FileDescriptor, int> openPlain(const Root& root, const std::string& path) {
     const std::string relative = path.substr(root.path == "/" ? 1 : root.path.size() + 1);
-    auto opened = openBeneath(root.descriptor.get(), relative.c_str(), O_PATH | O_DIRECTORY);
-    if (opened)
-        return std::move(*opened);
-    if (opened.error() == ELOOP)
-        return failed(what + " " + path + " is a symbolic link, or lies behind one", advice);
-    return failed(withReason(what + " " + path + " cannot be opened", opened.error()), advice);
+    return openBeneath(root.descriptor.get(), relative.c_str(), O_PATH | O_DIRECTORY);
+}
+
+std::string cannotOpen(const std::string& place, int error) {
+    if (error == ELOOP)
+        return place + " is a symbolic link, or lies behind one";
+    return withReason(place + " cannot be opened", error);
 }
 
 class Collector {
@@ -52,11 +67,13 @@ public:
                 return failed(what + " " + path + " lies in " + directory + ", which every program sees",
                               "give the daemon a root elsewhere");
         const std::string advice =
-            "somebody has changed the directory: look who can write to the one that holds it, put "
-            "the container back, or delete it with zorvanectl";
-        auto directory = openPlain(root_, path, what, advice);
+            "somebody has changed the directory: look who can write to the one that holds it, and put the container "
+            "back where it was";
+        auto directory = openPlain(root_, path);
+        if (!directory && directory.error() == ENOENT)
+            return std::unexpected(notFound(cannotOpen(what + " " + path, ENOENT), path, advice));
         if (!directory)
-            return std::unexpected(directory.error());
+            return failed(cannotOpen(what + " " + path, directory.error()), advice);
         struct stat status{};
         if (::fstat(directory->get(), &status) != 0)
             return failed(withReason(what + " " + path + " cannot be read", errno), advice);
@@ -94,9 +111,9 @@ public:
             clashes = clashes || isAtOrBelow(path, directory);
         if (clashes)
             return failed(path + " cannot be shown read-only", advice);
-        auto directory = openPlain(device, path, "the directory", advice);
+        auto directory = openPlain(device, path);
         if (!directory)
-            return std::unexpected(directory.error());
+            return failed(cannotOpen("the directory " + path, directory.error()), advice);
         mounts_.push_back({.kind = Mount::Kind::readOnly,
                            .identifier = {},
                            .path = path,
@@ -117,9 +134,10 @@ public:
                 const ssize_t length = ::readlinkat(device.descriptor.get(), path + 1, target, sizeof target);
                 mount.linkTarget.assign(target, static_cast<std::size_t>(std::max<ssize_t>(length, 0)));
             } else {
-                auto directory = openPlain(device, path, "the directory", "see what stands in its place");
+                auto directory = openPlain(device, path);
                 if (!directory)
-                    return std::unexpected(directory.error());
+                    return failed(cannotOpen(std::string("the directory ") + path, directory.error()),
+                                  "see what stands in its place");
                 mount.descriptor = std::move(*directory);
             }
             mounts_.push_back(std::move(mount));

@@ -24,6 +24,7 @@ a read-only system, and nothing else of any user. What is missing is made.
   --system-container ID  fail unless ID, which is the identifier, owns a system container
   --read-only DIR        show DIR too, read-only: the program's own files; may repeat
   --root DIR             system root of the daemon (default /)
+  --network none|host    no network but the program's own loopback (default), or the host's
   --bubblewrap FILE      the program that makes the sandbox (default /usr/bin/bwrap)
   --wait                 wait while the daemon keeps the program from being started
   --dry-run              say what would be mounted, run nothing
@@ -77,6 +78,7 @@ enum Option : int {
     systemGroup,
     systemContainer,
     readOnly,
+    network,
     bubblewrap,
     dryRun,
     wait,
@@ -93,6 +95,7 @@ constexpr option known[] = {
     {"system-group", required_argument, nullptr, Option::systemGroup},
     {"system-container", required_argument, nullptr, Option::systemContainer},
     {"read-only", required_argument, nullptr, Option::readOnly},
+    {"network", required_argument, nullptr, Option::network},
     {"bubblewrap", required_argument, nullptr, Option::bubblewrap},
     {"dry-run", no_argument, nullptr, Option::dryRun},
     {"wait", no_argument, nullptr, Option::wait},
@@ -127,6 +130,12 @@ std::optional<OptionsEnd> take(int option, const char* value, const char* argume
     case Option::readOnly:
         options.readOnly.emplace_back(value);
         return std::nullopt;
+    case Option::network:
+        if (const auto network = networkNamed(value)) {
+            options.network = *network;
+            return std::nullopt;
+        }
+        return usage("'" + std::string(value) + "' is no network: there are none and host");
     case Option::bubblewrap:
         options.bubblewrap = value;
         return std::nullopt;
@@ -151,6 +160,17 @@ std::optional<OptionsEnd> take(int option, const char* value, const char* argume
 }
 
 } // namespace
+
+const char* networkName(Network network) {
+    return network == Network::host ? "host" : "none";
+}
+
+std::optional<Network> networkNamed(std::string_view name) {
+    for (const Network network : {Network::none, Network::host})
+        if (name == networkName(network))
+            return network;
+    return std::nullopt;
+}
 
 std::expected<Options, OptionsEnd> parseOptions(int argumentCount, char** arguments) {
     Options options;

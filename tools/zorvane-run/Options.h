@@ -6,9 +6,17 @@
 #include <expected>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 namespace zorvanerun {
+
+/// Which network the program has: none but a loopback of its own, or the host's.
+enum class Network : std::uint8_t { none, host };
+/// "none" or "host".
+[[nodiscard]] const char* networkName(Network network);
+/// The network of that name.
+[[nodiscard]] std::optional<Network> networkNamed(std::string_view name);
 
 struct Options {
     std::string root = "/";
@@ -21,6 +29,7 @@ struct Options {
     std::optional<std::string> systemContainer;
     /// Directories that the program may read besides the system's own: its code, for instance.
     std::vector<std::string> readOnly;
+    Network network = Network::none;
     std::string bubblewrap = "/usr/bin/bwrap";
     bool dryRun = false;
     /// Wait for as long as the daemon keeps the program from being started.

@@ -31,6 +31,7 @@ nlohmann::json asJson(const Options& options, const std::vector<Mount>& mounts, 
             {"user", options.user},
             {"home", told.data},
             {"temporary", told.temporary},
+            {"network", networkName(options.network)},
             {"program", options.command},
             {"mounts", std::move(list)},
             {"environment", sandboxEnvironment(options, told)}};
@@ -53,8 +54,8 @@ int showPlan(const Options& options, const std::vector<Mount>& mounts, const Tol
         std::printf("%s\n", dumped(asJson(options, mounts, told)).c_str());
         return exitDone;
     }
-    std::printf("%s would run as user %u, in %s, with\n", printable(options.command.front()).c_str(), options.user,
-                printable(told.data).c_str());
+    std::printf("%s would run as user %u, in %s, with %s network and\n", printable(options.command.front()).c_str(),
+                options.user, printable(told.data).c_str(), options.network == Network::host ? "the host's" : "no");
     std::size_t width = 0;
     for (const Mount& mount : mounts)
         width = std::max(width, printable(mount.identifier).size());

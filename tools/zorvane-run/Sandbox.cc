@@ -13,8 +13,7 @@ namespace zorvanerun {
 
 namespace {
 
-/// For what several processes of the program share; it counts as the program's memory.
-constexpr const char* temporaryBytesMax = "67108864";
+constexpr const char* keysFile = "/proc/keys";
 
 void append(std::vector<std::string>& to, std::initializer_list<std::string> more) {
     to.insert(to.end(), more);
@@ -45,14 +44,21 @@ bool isPassedOn(std::string_view variable) {
 
 std::vector<std::string> sandboxArguments(const Options& options, const std::vector<Mount>& mounts,
                                           const ToldContainers& told, InsideHandles handles) {
-    std::vector<std::string> arguments = {options.bubblewrap, "--unshare-pid",     "--unshare-ipc", "--unshare-uts",
-                                          "--new-session",    "--die-with-parent", "--cap-drop",    "ALL"};
+    std::vector<std::string> arguments = {
+        options.bubblewrap, "--unshare-pid", "--unshare-ipc", "--unshare-uts", "--new-session", "--cap-drop", "ALL"};
+    if (options.network == Network::none)
+        arguments.emplace_back("--unshare-net");
     for (const char* capability : {"CAP_SETUID", "CAP_SETGID", "CAP_SETPCAP"})
         append(arguments, {"--cap-add", capability});
     append(arguments, {"--proc", "/proc", "--dev", "/dev"});
-    for (const char* place : {"/dev/shm", "/tmp"})
-        append(arguments, {"--perms", "1777", "--size", temporaryBytesMax, "--tmpfs", place});
-    std::set<std::string> made = {"/proc", "/dev", "/dev/shm", "/tmp"};
+    // The keys of all processes of the user, by name.
+    if (::access(keysFile, F_OK) == 0)
+        append(arguments, {"--ro-bind", "/dev/null", keysFile});
+    std::set<std::string> made = {"/proc", "/dev"};
+    for (std::size_t i = 0; i < memoryPlaces.size(); ++i) {
+        append(arguments, {"--bind", stagedMemoryPath(i), memoryPlaces[i]});
+        made.insert(memoryPlaces[i]);
+    }
     for (std::size_t i = 0; i < mounts.size(); ++i) {
         const Mount& mount = mounts[i];
         makeParents(arguments, mount.path, made);
@@ -61,8 +67,9 @@ std::vector<std::string> sandboxArguments(const Options& options, const std::vec
         else
             append(arguments, {"--symlink", mount.linkTarget, mount.path});
     }
-    append(arguments, {"--", "/proc/self/fd/" + std::to_string(handles.program), insideOption,
-                       std::to_string(handles.channel), std::to_string(options.user), told.data});
+    append(arguments,
+           {"--", "/proc/self/fd/" + std::to_string(handles.program), insideOption, std::to_string(handles.channel),
+            std::to_string(options.user), networkName(options.network), told.data});
     arguments.insert(arguments.end(), options.command.begin(), options.command.end());
     return arguments;
 }

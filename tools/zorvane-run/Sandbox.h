@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // The sandbox as its maker, bubblewrap, is told of it: arguments and environment. Pure, but for the caller's
-// environment.
+// environment and for a look whether the kernel lists keys.
 //
-// Inside there are namespaces of its own for mounts, processes, IPC and the host's name; of capabilities only those
-// with which Inside.h gives up the rest.
+// Inside there are namespaces of its own for mounts, processes, IPC, the host's name and, unless the host's is asked
+// for, the network; of capabilities only those with which Inside.h gives up the rest.
 #pragma once
 
 #include "Mounts.h"

@@ -15,10 +15,18 @@ namespace {
 /// Made for things that are mounted for a while; the sandbox shows nothing of it.
 constexpr const char* stagingDirectory = "/mnt";
 
+/// For each place; it counts as the program's memory. An inode, which `size` does not count, takes a kilobyte of the
+/// kernel's: one for each page is more than files of any content need.
+constexpr const char* memoryOptions = "mode=1777,size=64m,nr_inodes=16384";
+
 } // namespace
 
 std::string stagedPath(std::size_t index) {
     return std::string(stagingDirectory) + "/" + std::to_string(index);
+}
+
+std::string stagedMemoryPath(std::size_t index) {
+    return std::string(stagingDirectory) + "/memory" + std::to_string(index);
 }
 
 const char* stage(const std::vector<Mount>& mounts) {
@@ -48,6 +56,12 @@ const char* stage(const std::vector<Mount>& mounts) {
             return "mkdir";
         if (::move_mount(trees[i].get(), "", AT_FDCWD, place.c_str(), MOVE_MOUNT_F_EMPTY_PATH) != 0)
             return "move_mount";
+    }
+    for (std::size_t i = 0; i < memoryPlaces.size(); ++i) {
+        const std::string place = stagedMemoryPath(i);
+        if (::mkdir(place.c_str(), 0700) != 0 ||
+            ::mount("tmpfs", place.c_str(), "tmpfs", MS_NOSUID | MS_NODEV, memoryOptions) != 0)
+            return "mount of a tmpfs for what is shared in memory";
     }
     return nullptr;
 }

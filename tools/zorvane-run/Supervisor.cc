@@ -10,6 +10,7 @@
 #include <cstdio>
 #include <fcntl.h>
 #include <poll.h>
+#include <sched.h>
 #include <sys/prctl.h>
 #include <sys/signalfd.h>
 #include <sys/socket.h>
@@ -45,11 +46,15 @@ Failure failure(const std::string& what, int number) {
     return {.what = withReason(what, number), .advice = "see what limits this process"};
 }
 
-/// The process outside and, from when there is one, the program inside.
+int exitCodeOf(int status) {
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+}
+
+/// The namespace's process 1 and, from when there is one, the program inside.
 class Supervisor {
 public:
-    Supervisor(pid_t maker, FileDescriptor channel, FileDescriptor signals)
-        : maker_(maker), channel_(std::move(channel)), signals_(std::move(signals)) {}
+    Supervisor(pid_t keeper, FileDescriptor channel, FileDescriptor signals)
+        : keeper_(keeper), channel_(std::move(channel)), signals_(std::move(signals)) {}
 
     /// Waits for the end. nullopt when the program never began.
     std::optional<int> wait() {
@@ -95,8 +100,8 @@ private:
     }
 
     std::optional<int> end(int number) {
-        ::kill(maker_, number);
-        ::waitpid(maker_, nullptr, 0);
+        ::kill(keeper_, number);
+        ::waitpid(keeper_, nullptr, 0);
         return std::nullopt;
     }
 
@@ -105,31 +110,28 @@ private:
         int status = 0;
         pid_t waited = 0;
         do {
-            waited = ::waitpid(maker_, &status, WNOHANG);
+            waited = ::waitpid(keeper_, &status, WNOHANG);
         } while (waited < 0 && errno == EINTR);
-        if (waited != maker_)
+        if (waited != keeper_)
             return std::nullopt;
         if (channel_.valid())
             takeProgram();
         if (!program_.valid())
             return std::optional<int>();
-        return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+        return exitCodeOf(status);
     }
 
-    const pid_t maker_;
+    const pid_t keeper_;
     FileDescriptor channel_;
     FileDescriptor signals_;
     FileDescriptor program_;
     std::vector<int> early_;
 };
 
-/// In the child: becomes the maker of the sandbox. Never returns.
-[[noreturn]] void executeMaker(const std::vector<Mount>& mounts, InsideHandles handles, pid_t parent,
-                               std::vector<char*>& arguments, std::vector<char*>& environment) {
-    const char* failed = "prctl";
-    // Until the maker asks for the same itself.
-    if (::prctl(PR_SET_PDEATHSIG, SIGKILL) == 0 && ::getppid() == parent)
-        failed = stage(mounts);
+/// In a child of process 1: becomes the maker of the sandbox. Never returns.
+[[noreturn]] void executeMaker(const std::vector<Mount>& mounts, InsideHandles handles, std::vector<char*>& arguments,
+                               std::vector<char*>& environment) {
+    const char* failed = stage(mounts);
     if (!failed && !(keepOnExec(handles.program) && keepOnExec(handles.channel)))
         failed = "fcntl";
     // The signals stay blocked; only that of children is the maker's own to wait for.
@@ -142,6 +144,24 @@ private:
     }
     std::fprintf(stderr, "zorvane-run: %s\n", printable(withReason(failed, errno)).c_str());
     ::_exit(exitFailure);
+}
+
+/// In process 1 of the namespace: waits for the end of the maker, or of the launcher. Its own end is that of all
+/// others, whatever they are doing: so it executes nothing, and nothing that it is told can delay it. Never returns.
+[[noreturn]] void keep(int launcher, pid_t maker) {
+    const FileDescriptor end(static_cast<int>(::syscall(SYS_pidfd_open, maker, 0)));
+    pollfd events[] = {{.fd = launcher, .events = POLLIN, .revents = 0},
+                       {.fd = end.get(), .events = POLLIN, .revents = 0}};
+    // The signal is for when this process was stopped; by the descriptor no end of the launcher is missed.
+    if (maker < 0 || !end.valid() || ::prctl(PR_SET_PDEATHSIG, SIGKILL) != 0)
+        ::_exit(exitFailure);
+    while (events[0].revents == 0 && events[1].revents == 0)
+        if (::poll(events, 2, -1) < 0 && errno != EINTR)
+            ::_exit(exitFailure);
+    int status = 0;
+    if (events[0].revents != 0 || ::waitpid(maker, &status, 0) != maker)
+        ::_exit(exitFailure);
+    ::_exit(exitCodeOf(status));
 }
 
 } // namespace
@@ -167,14 +187,22 @@ Result<int> runSandboxed(const Options& options, const std::vector<Mount>& mount
     std::vector<std::string> environment = sandboxEnvironment(options, told);
     std::vector<char*> argumentPointers = pointersTo(arguments);
     std::vector<char*> environmentPointers = pointersTo(environment);
-    const pid_t self = ::getpid();
-    const pid_t maker = ::fork();
-    if (maker < 0)
+    const FileDescriptor self(static_cast<int>(::syscall(SYS_pidfd_open, ::getpid(), 0)));
+    // For what is started from here on, not for this process.
+    if (!self.valid() || ::unshare(CLONE_NEWPID) != 0)
+        return std::unexpected(failure("cannot make a namespace of processes", errno));
+    const pid_t keeper = ::fork();
+    if (keeper < 0)
         return std::unexpected(failure("cannot make a process", errno));
-    if (maker == 0)
-        executeMaker(mounts, handles, self, argumentPointers, environmentPointers);
+    if (keeper == 0) {
+        const pid_t maker = ::fork();
+        if (maker == 0)
+            executeMaker(mounts, handles, argumentPointers, environmentPointers);
+        inner.reset();
+        keep(self.get(), maker);
+    }
     inner.reset(); // or the channel would never end
-    if (const auto exitCode = Supervisor(maker, std::move(channel), std::move(signals)).wait())
+    if (const auto exitCode = Supervisor(keeper, std::move(channel), std::move(signals)).wait())
         return *exitCode;
     return std::unexpected(Failure{
         .what = "the sandbox could not be made; " + options.bubblewrap + " or zorvane-run said why above",

@@ -78,6 +78,11 @@ Result<int> run(const Options& options) {
     if (!zor::platform::fillStandardDescriptors() || !closeOnExecFrom(STDERR_FILENO + 1))
         return std::unexpected(Failure{.what = "cannot set up this process's descriptors",
                                        .advice = "use a kernel of 5.11 or newer, and mount /dev"});
+    if (auto why = whyStandardDescriptorRefused(options.network); !why.empty() && !options.dryRun)
+        return std::unexpected(
+            Failure{.what = std::move(why) + ", which would lead the program out of its sandbox",
+                    .advice = "give it a file, a pipe, a terminal or /dev/null; for a socket of the network, add "
+                              "--network host"});
     const auto root = Root::open(options.root);
     if (!root)
         return std::unexpected(root.error());
