@@ -53,7 +53,10 @@ bool Dispatcher::serve(platform::PeerConnection& connection, platform::ServiceEv
                    static_cast<unsigned long long>(command));
         return false;
     }
-    const platform::Identity identity = connection.peer().identify(platform::Peer::Explain::no);
+    platform::Identity identity = connection.peer().identify(platform::Peer::Explain::no);
+    // The words cost a look at the registry: only a peer that is nobody is to be explained.
+    if (!identity.grant)
+        identity = connection.peer().identify(platform::Peer::Explain::yes);
     const auto client = checkEntitlementsAndInitClientObject(row, identity);
     if (!client)
         return false;
@@ -83,7 +86,7 @@ Dispatcher::checkEntitlementsAndInitClientObject(const ZORCommandTableRow& row, 
     const std::string* identifier = identifierOf(identity);
     if (!identifier)
         ZOR_LOG(log_, logLevelError, "Failed to copy signing ID for pid %d : %s", identity.pid,
-                identity.grant ? "its registry entry has none" : "no registry entry matches it");
+                identity.grant ? "its registry entry has none" : ZOR_SHOWN(identity.explanation));
     const bool noneRequired = row.requiredEntitlement == noEntitlementRequired;
     const plist::Dictionary* entitlements =
         identity.grant && identity.grant->entitlements ? &*identity.grant->entitlements : nullptr;

@@ -34,6 +34,7 @@ constexpr int mallocArenas = 2;
     ::umask(022);
     ::mallopt(M_ARENA_MAX, mallocArenas);
     std::signal(SIGPIPE, SIG_IGN);
+    std::signal(SIGXFSZ, SIG_IGN); // a file that may not grow fails the write (EFBIG), not the daemon
     rlimit files{};
     if (::getrlimit(RLIMIT_NOFILE, &files) == 0) {
         files.rlim_cur = files.rlim_max; // a connection takes two or three
@@ -86,7 +87,6 @@ void addPlatformCounters(platform::LinuxPlatform& platform, plist::Dictionary& c
     counters.set("BufferedOutputBytes", listener.outputBytes);
     counters.set("ListenerThreads", listener.threads);
     counters.set("ListenerThreadsMost", listener.threadsMost);
-    counters.set("LogLinesLost", platform.log().linesLost());
 }
 
 /// The status is a help, not a service: without it the daemon goes on, and says so.
@@ -130,7 +130,10 @@ int main(int argumentCount, char** arguments) {
     const StopOnSignal stop(**platform);
     Composition composition((*platform)->roles());
     const auto notify = platform::NotifySocket::ofEnvironment();
-    Status status(composition, [&](plist::Dictionary& counters) { addPlatformCounters(**platform, counters); });
+    Status status(composition, [&](plist::Dictionary& counters) {
+        addPlatformCounters(**platform, counters);
+        counters.set("LogLinesLost", (*platform)->log().linesLost() + composition.log().linesLost());
+    });
     platform::StatusSocket statusSocket(
         (*platform)->peers(), (*platform)->runLoop(),
         [&](platform::Peer& peer, platform::StatusSocket::Detail detail) { return status.forPeer(peer, detail); });

@@ -23,6 +23,8 @@ public:
         met_.erase(met);
         return true;
     }
+    /// Files of which a name has been met and another has not.
+    [[nodiscard]] std::size_t unfinished() const { return met_.size(); }
     void forgetAll() { met_.clear(); }
 
 private:

@@ -24,12 +24,15 @@ public:
     explicit Describer(std::size_t bytesMax) : bytesMax_(bytesMax) {}
 
     void value(const Value& value, std::size_t depth);
+    /// `quoted`: quotation marks and backslashes of its own are escaped, for others to end it.
+    enum class Quoted { no, yes };
+    void text(std::string_view text, Quoted quoted);
     std::string finish() &&;
 
 private:
     [[nodiscard]] bool full() const { return out_.size() > bytesMax_; }
     void string(std::string_view text);
-    void character(std::string_view bytes, char32_t codePoint);
+    void character(std::string_view bytes, char32_t codePoint, Quoted quoted);
     void data(const Data& bytes);
     void array(const Array& values, std::size_t depth);
     void dictionary(const Dictionary& entries, std::size_t depth);
@@ -39,8 +42,8 @@ private:
     std::size_t bytesMax_;
 };
 
-void Describer::character(std::string_view bytes, char32_t codePoint) {
-    if (codePoint == '"' || codePoint == '\\') {
+void Describer::character(std::string_view bytes, char32_t codePoint, Quoted quoted) {
+    if (quoted == Quoted::yes && (codePoint == '"' || codePoint == '\\')) {
         out_ += '\\';
         out_ += bytes;
     } else if (codePoint == '\n') {
@@ -56,6 +59,11 @@ void Describer::character(std::string_view bytes, char32_t codePoint) {
 
 void Describer::string(std::string_view text) {
     out_ += '"';
+    this->text(text, Quoted::yes);
+    out_ += '"';
+}
+
+void Describer::text(std::string_view text, Quoted quoted) {
     while (!text.empty() && !full()) {
         const Utf8Character next = decodeUtf8(text);
         if (next.length == 0) {
@@ -65,11 +73,10 @@ void Describer::string(std::string_view text) {
             out_ += hexDigits[byte & 0xFU];
             text.remove_prefix(1);
         } else {
-            character(text.substr(0, next.length), next.codePoint);
+            character(text.substr(0, next.length), next.codePoint, quoted);
             text.remove_prefix(next.length);
         }
     }
-    out_ += '"';
 }
 
 void Describer::data(const Data& bytes) {
@@ -174,7 +181,10 @@ std::string describe(const Value* value, std::size_t bytesMax) {
     if (value == nullptr)
         return "(null)";
     Describer describer(bytesMax);
-    describer.value(*value, 0);
+    if (const std::string* text = value->asString())
+        describer.text(*text, Describer::Quoted::no);
+    else
+        describer.value(*value, 0);
     return std::move(describer).finish();
 }
 

@@ -115,7 +115,8 @@ private:
     std::variant<bool, std::int64_t, std::uint64_t, double, Date, std::string, Data, Array, Dictionary> storage_;
 };
 
-/// One line for people and logs: strings quoted and escaped, data as <hex>, cut at `bytesMax`. "(null)" for nullptr.
+/// One line for people and logs: a string as it is but for control characters, those inside of others quoted, data as
+/// <hex>, cut at `bytesMax`. "(null)" for nullptr.
 std::string describe(const Value* value, std::size_t bytesMax = 1024);
 
 } // namespace zor::plist

@@ -165,6 +165,7 @@ Result<platform::FileDescriptor> ZORDataProtectionChangeOperation::openContainer
 
 Result<void> ZORDataProtectionChangeOperation::walk(int container, const std::vector<Item>& items) {
     namesMet_.forgetAll();
+    foreignNames_ = 0;
     std::optional<ZORError> failure;
     for (const Item& item : items) {
         fs::TreeWalker walker(fs::WalkStatus::typeOnly);
@@ -181,7 +182,17 @@ Result<void> ZORDataProtectionChangeOperation::walk(int container, const std::ve
             services_.log.write(logLevelError, passFunction, "FTS returned error for %s : %s", item.path.c_str(),
                                 errorText(-status));
     }
+    saySharedFiles();
     return {};
+}
+
+void ZORDataProtectionChangeOperation::saySharedFiles() const {
+    const std::uint64_t left = namesMet_.unfinished() + foreignNames_;
+    if (left > 0)
+        services_.log.write(logLevelNotice, passFunction,
+                            "Left the protection class of %llu hard-linked files in %s as it is: they have names "
+                            "outside, or another owner",
+                            static_cast<unsigned long long>(left), dataContainerMetadata_->url().c_str());
 }
 
 Result<void> ZORDataProtectionChangeOperation::visit(const WalkEntry& entry, const Item& item) {
@@ -245,7 +256,12 @@ Result<void> ZORDataProtectionChangeOperation::setClass(const WalkEntry& entry, 
 bool ZORDataProtectionChangeOperation::isShared(const struct stat& status) {
     // The container's owner can rename during the walk, so that one name is met twice; by that he reaches what is his
     // own anyway, and nothing else.
-    return status.st_nlink > 1 && (status.st_uid != owner_ || !namesMet_.wasLast(status));
+    if (status.st_nlink <= 1)
+        return false;
+    if (status.st_uid == owner_)
+        return !namesMet_.wasLast(status);
+    ++foreignNames_;
+    return true;
 }
 
 } // namespace zor

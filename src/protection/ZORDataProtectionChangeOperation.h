@@ -91,6 +91,7 @@ private:
                           const Declines& declines);
     /// Whether a file, met under one of its names, may be somebody else's too.
     [[nodiscard]] bool isShared(const struct stat& status);
+    void saySharedFiles() const;
 
     StoreServices& services_;
     const std::shared_ptr<const ZORMetadata> dataContainerMetadata_;
@@ -103,6 +104,7 @@ private:
     // Of one pass.
     uid_t owner_ = 0; // the container's
     fs::NamesMet namesMet_;
+    std::uint64_t foreignNames_ = 0; // of files with several names and another owner than the container's
 };
 
 } // namespace zor

@@ -2,6 +2,7 @@
 // The identifier locks: who waits for whom, in which order several are taken, what misuse does; a load over all modes
 // in which plain variables are guarded by nothing else, for ThreadSanitizer to judge.
 #include "daemon/base/ZORLocks.h"
+#include "support/Allocations.h"
 #include "support/RecordingLog.h"
 
 #include <atomic>
@@ -128,6 +129,42 @@ TEST_F(Locks, AnAdmittedIdentifierComesBeforeAWriterOfAll) {
     all.wait();
     EXPECT_EQ(order, (std::vector<std::string>{"A", "all"}));
     EXPECT_EQ(locks.identifiersInUse(), 0U);
+}
+
+// A lock that could not be taken for want of memory is free, and one that was taken becomes free, whatever allocation
+// of the way fails, those of the traces included: each one in turn.
+TEST_F(Locks, AFailedAllocationLeavesNothingLocked) {
+    if (!support::allocationsCanFail())
+        GTEST_SKIP() << "the sanitizer's allocations do not fail";
+    const std::string names[] = {std::string(40, 'A'), std::string(40, 'B')};
+    const std::function<void()> uses[] = {
+        [&] { const IdentifierLock one(locks, names[0], LockMode::writing); },
+        [&] { const IdentifierLock one(locks, names[0], LockMode::reading); },
+        [&] { const AllIdentifiersLock all(locks, LockMode::writing); },
+        [&] {
+            std::vector<std::string> taken(names, names + 2);
+            auto released = taken;
+            locks._lock_identifier(std::move(taken), LockMode::writing);
+            locks.unlock_identifier(std::move(released));
+        },
+    };
+    for (const auto& use : uses)
+        for (std::size_t failing = 0;; ++failing) {
+            bool failed = false;
+            {
+                const support::FailingAllocations allocations(failing);
+                try {
+                    use();
+                } catch (const std::bad_alloc&) {
+                }
+                failed = support::FailingAllocations::anyFailed();
+            }
+            EXPECT_EQ(locks.identifiersInUse(), 0U) << failing;
+            EXPECT_TRUE(allIsFree());
+            if (!failed)
+                break;
+        }
+    EXPECT_GT(log.linesLost(), 0U);
 }
 
 // Misuse is said and leaves every counter as it was: the locks still exclude and still become free.

@@ -3,6 +3,7 @@
 #include "plist/Binary.h"
 #include "plist/Limits.h"
 #include "plist/Samples.h"
+#include "support/Allocations.h"
 
 #include <gtest/gtest.h>
 
@@ -16,7 +17,7 @@ namespace {
 /// Reads under watch: a value or a reason inside the input, in memory that the input pays for. The factor of two and
 /// the constant are the allocator's rounding and the reader itself.
 std::expected<Value, ReadError> readWatched(const Data& bytes) {
-    const MemoryWatch watch;
+    const support::MemoryWatch watch;
     auto read = readBinary(bytes);
     EXPECT_LE(watch.peakBytes(), 2 * memoryBytesMax(bytes.size()) + 1024);
     if (!read) {

@@ -74,12 +74,4 @@ void forEachDamage(const Data& whole, const Try& tryOne) {
         }
 }
 
-/// Watches what this thread allocates with operator new from here on.
-class MemoryWatch {
-public:
-    MemoryWatch();
-    /// The most bytes that lived at one time since.
-    [[nodiscard]] std::size_t peakBytes() const;
-};
-
 } // namespace zor::plist::test

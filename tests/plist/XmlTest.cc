@@ -3,6 +3,7 @@
 #include "plist/Xml.h"
 #include "plist/Read.h"
 #include "plist/Samples.h"
+#include "support/Allocations.h"
 
 #include <gtest/gtest.h>
 
@@ -153,7 +154,7 @@ TEST(Xml, Limits) {
         }
     }
     const std::string wide = inPlist("<array>" + repeated("<true/>", 100000) + "</array>");
-    const MemoryWatch watch;
+    const support::MemoryWatch watch;
     EXPECT_TRUE(readXml(bytesOf(wide)));
     EXPECT_LE(watch.peakBytes(), 32 * wide.size());
 

@@ -74,7 +74,8 @@ protected:
         world.log.take();
     }
     void as(std::shared_ptr<const platform::IdentityGrant> granted, std::uint32_t userId = mobile) {
-        connection.peer_.identity = {.pid = peerPid, .effectiveUserId = userId, .grant = std::move(granted)};
+        connection.peer_.identity = {
+            .pid = peerPid, .effectiveUserId = userId, .grant = std::move(granted), .explanation = "a.plist: why"};
     }
     void handle(platform::ServiceEvent event) { world.services().dispatcher().ZORProcessIpsiEvent(connection, event); }
     /// The one reply; the connection must have stayed open.

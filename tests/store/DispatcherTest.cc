@@ -23,7 +23,7 @@ TEST_F(Dispatch, Refusals) {
         Dictionary message;
         std::vector<LogLine> lines;
     };
-    const LogLine noEntry{3, admission, "Failed to copy signing ID for pid 4711 : no registry entry matches it"};
+    const LogLine noEntry{3, admission, "Failed to copy signing ID for pid 4711 : a.plist: why"};
     const LogLine noIdentifier{3, admission, "Failed to copy signing ID for pid 4711 : its registry entry has none"};
     const LogLine noWipe{3, admission, "No entitled containers to wipe"};
     const Dictionary list{{"Command", 1}};

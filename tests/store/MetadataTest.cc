@@ -40,6 +40,7 @@ TEST_F(Metadata, RefusesByTheFirstFailingStep) {
     const Row rows[] = {
         {"ZORMetadataPersona", 502, "Incorrect UserId: 502, expecting: 501" + at},
         {"ZORMetadataPersona", -1, "Incorrect UserId: -1, expecting: 501" + at},
+        {"ZORMetadataPersona", "502 \"", "Incorrect UserId: 502 \", expecting: 501" + at},
         {"ZORMetadataIdentifier", {}, "Invalid metadata Identifier: (null)" + at},
         {"ZORMetadataIdentifier", 5, "Invalid metadata Identifier: 5" + at},
         {"ZORMetadataUUID", {}, "Invalid metadata UUID String: (null)" + at},

@@ -317,6 +317,11 @@ TEST_F(Protection, HostileOwner) {
     world.disk().disarm();
     EXPECT_EQ(classOf("etc/outside/file"), 3);
     EXPECT_EQ(classOf(path + "Documents/one"), 1); // all its names are in the container
+    EXPECT_EQ(std::ranges::count_if(world.log.take(),
+                                    [](const support::LogLine& line) {
+                                        return line.level == 5 && line.message.starts_with("Left the protection class");
+                                    }),
+              1);
     files::remove(container.path + "/tmp");
     put("Documents/swapped/file", 3);
     std::jthread owner([&](const std::stop_token& stop) {

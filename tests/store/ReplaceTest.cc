@@ -206,6 +206,8 @@ TEST_F(Replace, WantOfDescriptorsNeitherLosesNorBringsBack) {
                 return replace(swap(&old, fresh, preserve));
             }();
             refused += !replaced;
+            for (const auto& line : world.log.take())
+                EXPECT_FALSE(line.message.find(" to staging  ") != std::string::npos) << line;
             const auto now = world.find(identifier);
             ASSERT_TRUE(now);
             EXPECT_TRUE(contentOf(*now) == "new" || (!replaced && contentOf(*now) == "old"));

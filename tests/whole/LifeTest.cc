@@ -5,11 +5,14 @@
 #include "support/LongRun.h"
 
 #include <atomic>
+#include <cerrno>
+#include <cstring>
 #include <filesystem>
 #include <future>
 #include <gtest/gtest.h>
 #include <random>
 #include <set>
+#include <sys/resource.h>
 #include <thread>
 
 namespace zor::whole {
@@ -32,6 +35,29 @@ TEST(Life, SecondDaemonAndSigtermAndBrokenCommandLines) {
         words.insert(words.end(), arguments.begin(), arguments.end());
         EXPECT_EQ(runProgram(words).exitStatus, status) << arguments[0];
     }
+}
+
+// Goal: a file that may not grow any further is an error that is told, by the daemon and by the tool, and no end.
+TEST(Life, FilesThatMayNotGrow) {
+    constexpr rlim_t bytes = 16'384;
+    const rlimit small{.rlim_cur = bytes, .rlim_max = RLIM_INFINITY};
+    DaemonProcess daemon;
+    daemon.start();
+    zorvane::Client client = daemon.client();
+    const auto made = client.createOrLookup(dataContainer("a"));
+    ASSERT_TRUE(made);
+    ASSERT_EQ(::prlimit(daemon.pid(), RLIMIT_FSIZE, &small, nullptr), 0);
+    const auto set = client.setInfoValue({dataApplication, mobile, "a", made->uuid}, "k", {{std::string(bytes, 'x')}});
+    ASSERT_FALSE(set);
+    EXPECT_EQ(set.error().code, 34U);
+    EXPECT_NE(daemon.log().find(std::strerror(EFBIG)), std::string::npos);
+    EXPECT_TRUE(client.createOrLookup(dataContainer("b")));
+    std::filesystem::create_directory(daemon.path("tmp/source"));
+    writeFile(daemon.path("tmp/source/large"), std::string(2 * bytes, 'x'));
+    Program tool(daemon.toolWords({"install", "--class", "2", "c", daemon.path("tmp/source")}),
+                 [&] { return ::setrlimit(RLIMIT_FSIZE, &small) == 0; });
+    EXPECT_LT(tool.wait(), 128);
+    EXPECT_NE(tool.said().find(std::strerror(EFBIG)), std::string::npos) << tool.said();
 }
 
 // Goal: transient containers end with the boot, others stay; a root that "reboots" does the boot's work once.

@@ -15,6 +15,7 @@
 #include "platform/linux/StandardDescriptors.h"
 
 #include <algorithm>
+#include <csignal>
 #include <cstdio>
 #include <cstring>
 #include <unistd.h>
@@ -99,6 +100,7 @@ Result<int> run(const Options& options) {
 int main(int argumentCount, char** arguments) {
     if (argumentCount > 1 && std::strcmp(arguments[1], insideOption) == 0)
         ::_exit(runInside(argumentCount, arguments)); // there is nothing to be tidied up in the sandbox
+    std::signal(SIGXFSZ, SIG_IGN);                    // a file that may not grow is an error to be told, not an end
     const auto options = parseOptions(argumentCount, arguments);
     if (!options) {
         std::fputs(options.error().text.c_str(), options.error().exitCode == exitDone ? stdout : stderr);

@@ -7,6 +7,7 @@
 
 #include <CLI/CLI.hpp>
 #include <algorithm>
+#include <csignal>
 #include <functional>
 #include <unistd.h>
 
@@ -311,6 +312,7 @@ Format formatOfUnparsed(int argumentCount, char** argumentValues) {
 } // namespace
 
 int main(int argumentCount, char** argumentValues) {
+    std::signal(SIGXFSZ, SIG_IGN); // a file that may not grow is an error to be told, not an end
     Arguments arguments;
     Action action;
     CLI::App app("Talks to zorvaned, the container manager.", "zorvanectl");

@@ -21,19 +21,27 @@ bool Log::writes(int level) const {
     return sink_.level() >= level;
 }
 
-void Log::write(int level, const char* function, const char* format, ...) const {
+void Log::write(int level, const char* function, const char* format, ...) const noexcept {
     std::va_list arguments;
     va_start(arguments, format);
-    writeText(level, function, formattedList(format, arguments));
+    try {
+        writeText(level, function, formattedList(format, arguments));
+    } catch (...) {
+        linesLost_.fetch_add(1, std::memory_order_relaxed);
+    }
     va_end(arguments);
 }
 
-void Log::writeText(int level, const char* function, std::string_view message) const {
+void Log::writeText(int level, const char* function, std::string_view message) const noexcept {
     if (!writes(level))
         return;
-    if (level <= logLevelError && provokingUserId && refusalGate_ && !refusalGate_(*provokingUserId))
-        return;
-    sink_.write(level, function, message);
+    try {
+        if (level <= logLevelError && provokingUserId && refusalGate_ && !refusalGate_(*provokingUserId))
+            return;
+        sink_.write(level, function, message);
+    } catch (...) {
+        linesLost_.fetch_add(1, std::memory_order_relaxed);
+    }
 }
 
 Shown::Shown(const std::string& text) : text_(text.c_str()) {

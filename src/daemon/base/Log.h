@@ -5,11 +5,15 @@
 // are written also when no log could be opened (to standard error); level 7 only to an open log whose level is 7 or
 // more. Any thread. Lines that a client provokes are limited for each user id while a ClientScope is open on the
 // thread.
+//
+// Writing a line never throws: who holds a lock, or gives one back, may say so. A line for which there is no memory is
+// lost, and counted.
 #pragma once
 
 #include "platform/Format.h"
 #include "platform/PlatformLog.h"
 
+#include <atomic>
 #include <cstdint>
 #include <functional>
 #include <optional>
@@ -37,8 +41,12 @@ public:
     void limitRefusals(RefusalGate gate) { refusalGate_ = std::move(gate); }
 
     [[nodiscard]] bool writes(int level) const;
-    void write(int level, const char* function, const char* format, ...) const __attribute__((format(printf, 4, 5)));
-    void writeText(int level, const char* function, std::string_view message) const;
+    void write(int level, const char* function, const char* format, ...) const noexcept
+        __attribute__((format(printf, 4, 5)));
+    void writeText(int level, const char* function, std::string_view message) const noexcept;
+
+    /// Lines that were lost here for want of memory, since the start.
+    [[nodiscard]] std::uint64_t linesLost() const { return linesLost_.load(std::memory_order_relaxed); }
 
     /// While open, level-3 lines of this thread count as provoked by `userId`.
     class ClientScope {
@@ -55,6 +63,7 @@ public:
 private:
     platform::PlatformLog& sink_;
     RefusalGate refusalGate_;
+    mutable std::atomic<std::uint64_t> linesLost_{0};
 };
 
 /// What "%s" prints for an object: at most shownBytesMax bytes; an absent one is "(null)". Copies only what it must

@@ -21,6 +21,13 @@ const char* name(LockMode mode) {
     return mode == LockMode::writing ? "writing" : "reading";
 }
 
+constexpr const char* takeFunction = "take_one_lock";
+
+/// How much of an identifier a line shows. Lines are written where nothing may throw, so none is copied for them.
+int shownBytes(std::string_view identifier) {
+    return static_cast<int>(std::min(identifier.size(), shownBytesMax));
+}
+
 void sortOnce(std::vector<std::string>& identifiers) {
     std::ranges::sort(identifiers);
     identifiers.erase(std::ranges::unique(identifiers).begin(), identifiers.end());
@@ -30,8 +37,15 @@ void sortOnce(std::vector<std::string>& identifiers) {
 
 void ZORLocks::_lock_identifier(std::vector<std::string> identifiers, LockMode mode) {
     sortOnce(identifiers);
-    for (const std::string& identifier : identifiers)
-        take_one_lock(identifier, mode);
+    std::size_t taken = 0;
+    try {
+        for (; taken < identifiers.size(); ++taken)
+            take_one_lock(identifiers[taken], mode);
+    } catch (...) {
+        while (taken > 0)
+            unlock_one_lock(identifiers[--taken]);
+        throw;
+    }
 }
 
 void ZORLocks::unlock_identifier(std::vector<std::string> identifiers) {
@@ -52,51 +66,55 @@ void ZORLocks::waitForAll(platform::ConditionVariable& condition) {
 }
 
 void ZORLocks::take_one_lock(std::string_view identifier, LockMode mode) {
-    const std::string shown(identifier);
-    Record* record = nullptr;
-    {
-        const MutexLock held(mutex_);
-        if (mode == LockMode::writing)
-            while (allReaderWriterState_ != 0)
-                waitForAll(identifierWriter_);
-        else
-            while (allReaderWriterState_ == -1)
-                waitForAll(identifierReader_);
-        // The record first: it may throw for want of memory, and the counters must not know of this caller then.
-        const auto found = identifierToLockMap_.find(identifier);
-        if (found != identifierToLockMap_.end()) {
-            record = found->second.get();
-            ++record->userCount;
-        } else {
-            record = identifierToLockMap_.emplace(shown, std::make_unique<Record>()).first->second.get();
-        }
-        ++(mode == LockMode::writing ? identifierWriterCount_ : identifierReaderCount_);
-    }
-    // The record stays: this caller is in its user count.
-    ZOR_LOG(log_, logLevelDebug, "Waiting to lock %s for %s", ZOR_SHOWN(shown), name(mode));
-    if (mode == LockMode::writing) {
-        if (!record->lock.try_lock()) {
-            const BlockingScope blocking;
-            record->lock.lock();
-        }
-        std::int32_t expected = 0;
-        record->lockState.compare_exchange_strong(expected, -1);
-    } else {
-        if (!record->lock.try_lock_shared()) {
-            const BlockingScope blocking;
-            record->lock.lock_shared();
-        }
-        record->lockState.fetch_add(1);
-    }
-    ZOR_LOG(log_, logLevelDebug, "Got lock on identifier %s", ZOR_SHOWN(shown));
+    acquire(admit(identifier, mode), identifier, mode);
 }
 
-void ZORLocks::unlock_one_lock(std::string_view identifier) {
-    // Needs no memory but for its lines: this is how a caller that found none goes.
+ZORLocks::Record& ZORLocks::admit(std::string_view identifier, LockMode mode) {
+    const MutexLock held(mutex_);
+    if (mode == LockMode::writing)
+        while (allReaderWriterState_ != 0)
+            waitForAll(identifierWriter_);
+    else
+        while (allReaderWriterState_ == -1)
+            waitForAll(identifierReader_);
+    // The record first: it may throw, and the counters must not know of this caller then.
+    auto found = identifierToLockMap_.find(identifier);
+    if (found != identifierToLockMap_.end())
+        ++found->second->userCount;
+    else
+        found = identifierToLockMap_.emplace(identifier, std::make_unique<Record>()).first;
+    ++(mode == LockMode::writing ? identifierWriterCount_ : identifierReaderCount_);
+    return *found->second;
+}
+
+void ZORLocks::acquire(Record& record, std::string_view identifier, LockMode mode) noexcept {
+    if (log_.writes(logLevelDebug))
+        log_.write(logLevelDebug, takeFunction, "Waiting to lock %.*s for %s", shownBytes(identifier),
+                   identifier.data(), name(mode));
+    if (mode == LockMode::writing) {
+        if (!record.lock.try_lock()) {
+            const BlockingScope blocking;
+            record.lock.lock();
+        }
+        std::int32_t expected = 0;
+        record.lockState.compare_exchange_strong(expected, -1);
+    } else {
+        if (!record.lock.try_lock_shared()) {
+            const BlockingScope blocking;
+            record.lock.lock_shared();
+        }
+        record.lockState.fetch_add(1);
+    }
+    if (log_.writes(logLevelDebug))
+        log_.write(logLevelDebug, takeFunction, "Got lock on identifier %.*s", shownBytes(identifier),
+                   identifier.data());
+}
+
+void ZORLocks::unlock_one_lock(std::string_view identifier) noexcept {
     const MutexLock held(mutex_);
     const auto found = identifierToLockMap_.find(identifier);
     if (found == identifierToLockMap_.end() || found->second->lockState == 0) {
-        log_.write(logLevelError, __func__, "Identifier %s is not locked", ZOR_SHOWN(std::string(identifier)));
+        log_.write(logLevelError, __func__, "Identifier %.*s is not locked", shownBytes(identifier), identifier.data());
         return;
     }
     Record& record = *found->second;
@@ -117,14 +135,14 @@ void ZORLocks::unlock_one_lock(std::string_view identifier) {
         --record.userCount;
         record.lock.unlock_shared();
     }
-    ZOR_LOG(log_, logLevelDebug, "Unlocked identifier %s", ZOR_SHOWN(std::string(identifier)));
+    ZOR_LOG(log_, logLevelDebug, "Unlocked identifier %.*s", shownBytes(identifier), identifier.data());
     if (record.userCount == 0) {
-        ZOR_LOG(log_, logLevelDebug, "Destroying lock for identifier %s", ZOR_SHOWN(std::string(identifier)));
+        ZOR_LOG(log_, logLevelDebug, "Destroying lock for identifier %.*s", shownBytes(identifier), identifier.data());
         identifierToLockMap_.erase(found);
     }
 }
 
-void ZORLocks::_lock_all_identifiers(LockMode mode) {
+void ZORLocks::_lock_all_identifiers(LockMode mode) noexcept {
     ZOR_LOG(log_, logLevelDebug, "Waiting to lock all identifiers for %s", name(mode));
     const MutexLock held(mutex_);
     if (mode == LockMode::writing) {
@@ -142,7 +160,7 @@ void ZORLocks::_lock_all_identifiers(LockMode mode) {
     ZOR_LOG(log_, logLevelDebug, "Locked all identifiers for %s", name(mode));
 }
 
-void ZORLocks::unlock_all_identifiers() {
+void ZORLocks::unlock_all_identifiers() noexcept {
     {
         const MutexLock held(mutex_);
         if (allReaderWriterState_ == 0) {

@@ -9,7 +9,10 @@
 // One mutex guards the bookkeeping and is never held while a caller waits for an identifier's own lock. A caller counts
 // before it waits there, so a pending identifier lock already keeps an all-identifiers writer out. Several identifiers
 // are locked in ascending order of their strings; that is the lock order of the daemon, so overlapping sets cannot
-// deadlock. Nothing here fails or times out.
+// deadlock. Nothing here times out.
+//
+// Taking an identifier's lock may throw for want of memory, and changes nothing then: from the count of a caller on
+// nothing throws, and nothing does that gives a lock back. So a lock that is counted has an owner who gives it back.
 //
 // Misuse (unlocking what is not locked) is said at level 3 and changes nothing.
 #pragma once
@@ -38,17 +41,17 @@ public:
     ZORLocks& operator=(const ZORLocks&) = delete;
 
     void _lock_identifier(std::string_view identifier, LockMode mode) { take_one_lock(identifier, mode); }
-    void unlock_identifier(std::string_view identifier) { unlock_one_lock(identifier); }
+    void unlock_identifier(std::string_view identifier) noexcept { unlock_one_lock(identifier); }
     /// Each distinct identifier once, in ascending order.
     void _lock_identifier(std::vector<std::string> identifiers, LockMode mode);
     /// The same set as was locked, in descending order.
     void unlock_identifier(std::vector<std::string> identifiers);
 
-    void _lock_all_identifiers(LockMode mode) ZOR_EXCLUDES(mutex_);
-    void unlock_all_identifiers() ZOR_EXCLUDES(mutex_);
+    void _lock_all_identifiers(LockMode mode) noexcept ZOR_EXCLUDES(mutex_);
+    void unlock_all_identifiers() noexcept ZOR_EXCLUDES(mutex_);
 
     void take_one_lock(std::string_view identifier, LockMode mode) ZOR_EXCLUDES(mutex_);
-    void unlock_one_lock(std::string_view identifier) ZOR_EXCLUDES(mutex_);
+    void unlock_one_lock(std::string_view identifier) noexcept ZOR_EXCLUDES(mutex_);
 
     /// How many identifiers are locked or awaited, for tests and the status.
     [[nodiscard]] std::size_t identifiersInUse() const ZOR_EXCLUDES(mutex_);
@@ -66,6 +69,11 @@ private:
     [[nodiscard]] bool everythingIsFree() const ZOR_REQUIRES(mutex_) {
         return allReaderWriterState_ == 0 && noIdentifierIsLocked();
     }
+    /// Counts a caller in, which from then on keeps the record and whoever wants all identifiers out. Throws
+    /// std::bad_alloc, and has counted nobody then.
+    Record& admit(std::string_view identifier, LockMode mode) ZOR_EXCLUDES(mutex_);
+    /// Waits for the own lock of an identifier whose caller is counted.
+    void acquire(Record& record, std::string_view identifier, LockMode mode) noexcept;
     /// Lets others run, without the mutex.
     void yield() ZOR_REQUIRES(mutex_);
     void waitForAll(platform::ConditionVariable& condition) ZOR_REQUIRES(mutex_);

@@ -205,12 +205,12 @@ Result<void> ZORClientConnection::refuseSecondOfIdentifier(const ReplaceProgress
 Result<void> ZORClientConnection::moveOldAway(const ReplaceRequest& request, ReplaceProgress& progress) {
     const Log& log = services_.log;
     const Here here{replaceFunction, __LINE__};
-    const auto oldNotMoved = [&](const ZORError& cause) {
-        return makeError(log, here, ErrorCode::oldNotMovedToStaging, &cause, LogFlag::yes,
-                         "Failed to move old %s to staging %s", progress.oldUrl.c_str(), progress.stagingUrl.c_str());
-    };
     const UUID journalUuid = UUID::random();
     const FileURL stagingUrl = services_.configuration.stagingDirectory().appendingDirectory(journalUuid.string());
+    const auto oldNotMoved = [&](const ZORError& cause) {
+        return makeError(log, here, ErrorCode::oldNotMovedToStaging, &cause, LogFlag::yes,
+                         "Failed to move old %s to staging %s", progress.oldUrl.c_str(), stagingUrl.c_str());
+    };
     // Whoever owns them may have put something else in their places.
     for (const FileURL* url : {&progress.oldUrl, &progress.newUrl})
         if (const auto opened = services_.fileManager.resolver().openDirectory(*url); !opened)
