@@ -117,9 +117,10 @@ int Copier::visit(const WalkEntry& entry) {
     // The walk dropped levels that were moved away: what was copied of them is not whole.
     if (destination_.depth() != entry.depth + (leaving ? 1 : 0))
         return -ESTALE;
-    // A link is asked about once its target is known.
-    if (rules_ && entry.depth > 0 && !leaving && entry.kind != WalkEntryKind::symbolicLink)
-        if (const int refused = rules_->admit(entry, nullptr); refused < 0)
+    // A link is asked about once its target is known, and a file once it is open: it may be another one by then.
+    const bool askedLater = entry.kind == WalkEntryKind::symbolicLink || entry.kind == WalkEntryKind::file;
+    if (rules_ && entry.depth > 0 && !leaving && !askedLater)
+        if (const int refused = rules_->admit(entry, entry.directory, nullptr); refused < 0)
             return refused;
     switch (entry.kind) {
     case WalkEntryKind::directory:
@@ -199,6 +200,12 @@ int Copier::copyFile(const WalkEntry& entry) {
         return -errno;
     if (!S_ISREG(status.st_mode))
         return -ESTALE;
+    if (rules_) {
+        WalkEntry opened = entry;
+        opened.status = status;
+        if (const int refused = rules_->admit(opened, source->get(), nullptr); refused < 0)
+            return refused;
+    }
     if (status.st_nlink < 2 || entry.depth == 0)
         return copyFileAs(*source, status, entry);
     if (const int opened = openLinks(); opened < 0)
@@ -243,7 +250,7 @@ int Copier::copyLink(const WalkEntry& entry) {
         return -ENAMETOOLONG;
     target[static_cast<std::size_t>(length)] = '\0';
     if (rules_)
-        if (const int refused = rules_->admit(entry, target.data()); refused < 0)
+        if (const int refused = rules_->admit(entry, -1, target.data()); refused < 0)
             return refused;
     const int made = disk_.makeSymbolicLink(target.data(), destinationParent(), destinationName(entry));
     return made < 0 ? made : finishUnopened(entry, S_IFLNK);

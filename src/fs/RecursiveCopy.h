@@ -39,8 +39,10 @@ int copyTree(platform::Disk& disk, int fromDirectory, const char* from, int toDi
 struct ContentRules {
     uid_t owner = 0;
     gid_t group = 0;
-    /// Asked about each item before it is copied; of a symbolic link with its target. Not 0, a -errno, ends the copy.
-    std::function<int(const WalkEntry& entry, const char* linkTarget)> admit;
+    /// Asked about each item before it is copied, with the status of what will be: `item` is the open file or
+    /// directory, -1 for all else and where none could be opened. Of a symbolic link with its target. Not 0, a -errno,
+    /// ends the copy.
+    std::function<int(const WalkEntry& entry, int item, const char* linkTarget)> admit;
     /// Told of each piece of a file that was copied; the same.
     std::function<int(std::uint64_t bytes)> copied;
     /// Told of the item at which the copy ended.

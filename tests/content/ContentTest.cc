@@ -14,6 +14,7 @@
 
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <chrono>
 #include <cstring>
 #include <fcntl.h>
@@ -33,6 +34,7 @@
 #include <sys/uio.h>
 #include <sys/un.h>
 #include <sys/wait.h>
+#include <sys/xattr.h>
 #include <thread>
 #include <unistd.h>
 
@@ -284,6 +286,30 @@ TEST(Content, HostileDirectories) {
         {"metadata", [](const std::string& folder) { writeFile(folder + "/../../" + metadata, "forged"); }},
         {"another file system", [](const std::string& folder) { ::mount("none", folder.c_str(), "tmpfs", 0, ""); },
          true},
+        // What is root's, in directories of somebody who may have moved it there.
+        {"closed to user 501",
+         [](const std::string& folder) {
+             writeFile(folder + "/x", "SECRET");
+             ::chmod((folder + "/x").c_str(), 0640);
+             (void)!::chown(folder.c_str(), ownerId, ownerId);
+         },
+         true},
+        {"closed to user 501",
+         [](const std::string& folder) {
+             ::chmod(folder.c_str(), 0700);
+             (void)!::chown((folder + "/../..").c_str(), ownerId, ownerId);
+         },
+         true},
+        {"closed to user 501",
+         [](const std::string& folder) {
+             writeFile(folder + "/x", "SECRET");
+             // For user 501 alone, nothing.
+             constexpr char list[] = "\2\0\0\0\1\0\6\0\xff\xff\xff\xff\2\0\0\0\xf5\1\0\0\4\0\4\0\xff\xff\xff\xff"
+                                     "\20\0\4\0\xff\xff\xff\xff \0\4\0\xff\xff\xff\xff";
+             EXPECT_EQ(::setxattr((folder + "/x").c_str(), "system.posix_acl_access", list, sizeof list - 1, 0), 0);
+             (void)!::chown((folder + "/..").c_str(), ownerId, ownerId);
+         },
+         true},
     };
     for (const auto& row : rows) {
         SCOPED_TRACE(row.why);
@@ -298,6 +324,92 @@ TEST(Content, HostileDirectories) {
     }
     World world;
     world.expectRefused(world.put(""), "holds the container itself");
+}
+
+// Goal: root is not led to what is closed to those who had a hand in the path of an operand. Method: a table of paths
+// in directories of root's and of others, each with the reason, or none where it may be installed.
+TEST(Content, OperandsThatOthersHold) {
+    if (::geteuid() != 0)
+        GTEST_SKIP() << "needs root: directories of several users";
+    World world;
+    const auto give = [](const std::string& path, uid_t owner) { ASSERT_EQ(::lchown(path.c_str(), owner, owner), 0); };
+    const auto link = [&](const std::string& target, const std::string& path, uid_t owner) {
+        ASSERT_EQ(::symlink(target.c_str(), path.c_str()), 0);
+        give(path, owner);
+    };
+    const std::string his = world.path("/his");
+    const std::string roots = world.path("/roots");
+    for (const std::string& folder : {his, roots, roots + "/folder", his + "/folder"})
+        std::filesystem::create_directory(folder);
+    const std::tuple<std::string, uid_t, mode_t> archives[] = {
+        {roots + "/closed", 0, 0600}, {roots + "/another's", 502, 0644}, {his + "/own", ownerId, 0600},
+        {his + "/closed", 0, 0640},   {his + "/open", 0, 0644},          {his + "/another's", 502, 0644},
+    };
+    for (const auto& [path, owner, mode] : archives) {
+        writeFile(path, makeArchive(Form::tar, {file("f")}));
+        ::chmod(path.c_str(), mode);
+        give(path, owner);
+    }
+    ::chmod((his + "/folder").c_str(), 0700); // root's, renamed by whom the directory belongs to
+    link("/" + roots.substr(1) + "/closed", his + "/link", ownerId);
+    link("../roots", his + "/way", ownerId);
+    link("../roots/closed", his + "/rootsLink", 0);
+    link("../his", roots + "/rootsLink", 0);
+    link("rootsLoop", roots + "/rootsLoop", 0);
+    give(his, ownerId);
+    const std::pair<const char*, const char*> rows[] = {
+        {"/roots/closed", ""},
+        {"/roots//./../roots/closed", ""},
+        {"/roots/folder/", ""},
+        {"/roots/another's", "belongs to user 502, and the directory"},
+        {"/roots/rootsLink/own", ""},
+        {"/roots/rootsLoop", "Too many levels"},
+        {"/his/own", ""},
+        {"/his/open", ""},
+        {"/his/own/", "Not a directory"},
+        {"/his/closed", "closed to user 501"},
+        {"/his/folder", "closed to user 501"},
+        {"/his/another's", "belongs to user 502, and the directory"},
+        {"/his/link", "link is a symbolic link of user 501"},
+        {"/his/way/closed", "way is a symbolic link of user 501"},
+        {"/his/way/", "way is a symbolic link of user 501"},
+        {"/his/rootsLink", "closed to user 501"}, // root's link, but at a place of his choice
+        {"/his/absent", "No such file"},
+    };
+    for (const auto& [path, why] : rows) {
+        const auto outcome = Source::open(world.path(path));
+        const std::string said = outcome ? "" : outcome.error().what;
+        EXPECT_TRUE(*why == '\0' ? said.empty() : said.find(why) != said.npos) << path << ": " << said;
+    }
+    EXPECT_FALSE(Source::open(""));
+    const std::string open = his + "/folder/open";
+    writeFile(open, "for all");
+    writeFile(his + "/folder/closed", "his own");
+    ::chmod((his + "/folder/closed").c_str(), 0600);
+    give(his + "/folder", ownerId);
+    give(his + "/folder/closed", ownerId);
+    EXPECT_TRUE(world.put("/his/folder"));
+    // A file of his that is another one by the time it is opened.
+    writeFile(his + "/secret", "SECRET");
+    ::chmod((his + "/secret").c_str(), 0600);
+    std::atomic<bool> ends{false};
+    std::thread swapping([&] {
+        while (!ends)
+            ::renameat2(AT_FDCWD, open.c_str(), AT_FDCWD, (his + "/secret").c_str(), RENAME_EXCHANGE);
+    });
+    for (int round = 0; round < 300; ++round) {
+        World target;
+        const auto source = Source::open(his + "/folder");
+        zor::platform::LinuxDisk disk(zor::platform::Syncs::off);
+        const FileDescriptor container(::open(target.path("/container").c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+        if (!putContent(disk, container.get(), *source, {}, noSignal))
+            continue;
+        std::string read;
+        std::getline(std::ifstream(target.path("/container/open")), read);
+        EXPECT_NE(read, "SECRET");
+    }
+    ends = true;
+    swapping.join();
 }
 
 // Goal: a directory comes in as it is, but as the container's. Method: what may be in one, compared item by item.

@@ -106,7 +106,8 @@ int Installation::run(Consent consent) {
                                   "name another class", what_);
     auto source = content::Source::open(options_.source);
     if (!source)
-        return output_.localError(exitUsage, source.error().what, "name an archive or a directory", what_);
+        return output_.localError(exitUsage, source.error().what,
+                                  "name an archive or a directory that its own owner, or root, has put there", what_);
     source_ = std::move(*source);
     auto client = Client::connect(connect_);
     if (!client)

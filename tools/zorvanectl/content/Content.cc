@@ -51,13 +51,15 @@ Outcome<void> unpack(zor::platform::Disk& disk, const SealedDirectory& sealed, c
 /// Copies a directory, and keeps why an item was refused.
 class DirectoryCopy {
 public:
-    DirectoryCopy(const struct stat& container, Course& course) : container_(container), course_(course) {}
+    DirectoryCopy(const struct stat& container, const Source& source, Course& course)
+        : container_(container), holders_(source.holders()), course_(course) {}
 
     [[nodiscard]] Outcome<void> copy(zor::platform::Disk& disk, const Source& source, const SealedDirectory& sealed) {
         const zor::fs::ContentRules rules{
             .owner = container_.st_uid,
             .group = container_.st_gid,
-            .admit = [this](const zor::fs::WalkEntry& entry, const char* target) { return admit(entry, target); },
+            .admit = [this](const zor::fs::WalkEntry& entry, int item,
+                            const char* target) { return admit(entry, item, target); },
             .copied = [this](std::uint64_t bytes) { return answer(course_.addBytes(bytes)); },
             .failed = [this](const zor::fs::WalkEntry& entry, int error) { fail(entry, error); }};
         const int result = zor::fs::copyContent(disk, source.get(), sealed.get(), rules);
@@ -67,13 +69,17 @@ public:
     }
 
 private:
-    int admit(const zor::fs::WalkEntry& entry, const char* target) {
+    int admit(const zor::fs::WalkEntry& entry, int item, const char* target) {
         if (entry.status.st_dev == container_.st_dev && entry.status.st_ino == container_.st_ino)
             return answer(failed("the source holds the container itself"));
         const std::string name = entry.path();
-        const Item item{.name = name, .mode = entry.status.st_mode, .linkTarget = target ? target : ""};
-        if (const auto why = whyRefused(item))
+        if (const auto why =
+                whyRefused({.name = name, .mode = entry.status.st_mode, .linkTarget = target ? target : ""}))
             return answer(failed(refusal(name, *why)));
+        if (const auto why = holders_.whyRefused(entry.depth, entry.status, item))
+            return answer(failed(refusal(name, *why)));
+        if (S_ISDIR(entry.status.st_mode))
+            holders_.enter(entry.depth, entry.status.st_uid);
         return answer(course_.addItem());
     }
 
@@ -95,6 +101,7 @@ private:
     }
 
     const struct stat& container_;
+    Holders holders_;
     Course& course_;
     std::optional<Failure> failure_;
 };
@@ -103,10 +110,12 @@ private:
 
 Outcome<Source> Source::open(const std::string& path) {
     Source source;
-    // What is no regular file must not hold the opening.
-    source.file_.reset(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+    auto file = openForInstallation(path, source.holders_);
+    if (!file)
+        return std::unexpected(file.error());
+    source.file_ = std::move(*file);
     struct stat status{};
-    if (!source.file_.valid() || ::fstat(source.file_.get(), &status) != 0)
+    if (::fstat(source.file_.get(), &status) != 0)
         return failed(zorvane::printable(path) + " cannot be opened", errno);
     if (!S_ISDIR(status.st_mode) && !S_ISREG(status.st_mode))
         return failed(zorvane::printable(path) + " is neither a directory nor a file");
@@ -134,7 +143,7 @@ Outcome<Progress> putContent(zor::platform::Disk& disk, int container, const Sou
     if (source.isDirectory()) {
         if (observer.wantsShare)
             course.expectBytes(zor::fs::diskUsage(source.get(), {}, {}).bytes);
-        done = DirectoryCopy(status, course).copy(disk, source, *sealed);
+        done = DirectoryCopy(status, source, course).copy(disk, source, *sealed);
     } else {
         done = unpack(disk, *sealed, source, {.user = status.st_uid, .group = status.st_gid}, course);
     }

@@ -11,6 +11,7 @@
 
 #include "Course.h"
 #include "Failure.h"
+#include "Holders.h"
 #include "platform/Disk.h"
 #include "platform/FileDescriptor.h"
 
@@ -23,15 +24,17 @@ namespace zorvanectl::content {
 /// An open archive or directory.
 class Source {
 public:
-    /// A path of the caller's own, followed wherever it leads.
+    /// A path of the caller's own; openForInstallation says how far it is followed.
     [[nodiscard]] static Outcome<Source> open(const std::string& path);
 
     [[nodiscard]] bool isDirectory() const { return isDirectory_; }
     [[nodiscard]] int get() const { return file_.get(); }
+    [[nodiscard]] const Holders& holders() const { return holders_; }
     [[nodiscard]] std::uint64_t bytes() const { return bytes_; }
 
 private:
     zor::platform::FileDescriptor file_;
+    Holders holders_;
     bool isDirectory_ = false;
     std::uint64_t bytes_ = 0; // of the archive's file
 };
