@@ -282,14 +282,30 @@ void ContainerCheck::remember(ClassDirectory& directory, const Container& contai
     const auto [row, isFirst] = directory.known.try_emplace(container.record->identifier(), container.url);
     if (isFirst)
         return;
-    // Of two, the one that the directory lists later counts.
-    const FileURL hidden = std::exchange(row->second, container.url);
-    const std::string what =
-        "has the identifier of " + std::string(container.url.lastPathComponent()) + ", which clients are given";
+    // Of two, the one that the directory lists later counts; a daemon that runs may have read another order.
+    FileURL hidden = std::exchange(row->second, container.url);
+    const CheckOptions& options = look_.options();
+    const bool asks = options.daemonServes && !directory.transient;
+    const auto served = asks && options.servedPath
+                            ? options.servedPath(directory.containerClass, directory.user, row->first)
+                            : std::nullopt;
+    const auto isServed = [&](const FileURL& url) {
+        return served && FileURL::directory(*served).lastPathComponent() == url.lastPathComponent();
+    };
+    if (isServed(hidden))
+        std::swap(hidden, row->second);
+    const bool known = !asks || isServed(row->second);
+    const std::string what = "has the identifier of " + std::string(row->second.lastPathComponent()) +
+                             (known ? ", which clients are given"
+                                    : "; the daemon does not say which of them its clients are given, and has to be "
+                                      "started again after one was moved");
+    std::string command = look_.moveAside(hidden);
+    if (!known && look_.device().root().canonicalPath() == "/")
+        command += " && systemctl try-restart zorvaned.service";
     // A boot clears all transient ones.
     Finding& finding = directory.transient
                            ? look_.add(FindingCode::doubledContainer, hidden, what, Mender::boot)
-                           : look_.addForPerson(FindingCode::doubledContainer, hidden, what, look_.moveAside(hidden));
+                           : look_.addForPerson(FindingCode::doubledContainer, hidden, what, std::move(command));
     finding.containerClass = directory.containerClass;
     finding.user = directory.user;
     finding.identifier = container.record->identifier();

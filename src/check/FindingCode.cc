@@ -28,8 +28,11 @@ constexpr std::array<FindingPage, findingCodeCount> pages = {{
      "move it to the directory where it belongs, and start the daemon again"},
     {FindingCode::doubledContainer, "doubled-container", fault, "an identifier has two containers of one class",
      "somebody copied a container, or an error met a replace whose journal was removed by hand",
-     "clients are given the one that the directory lists last; the other one is invisible and takes its space",
-     "compare them, and move the one that is not wanted out of the class directory"},
+     "clients are given one of them, after a start of the daemon the one that the directory lists last; the other one "
+     "is "
+     "invisible and takes its space",
+     "compare them, and move the one that is not wanted out of the class directory, with the command that the check "
+     "names for the one that clients are not given; after moving the other one start the daemon again"},
     {FindingCode::containerName, "container-name", fault,
      "something in a class directory has a name that no container has",
      "somebody put it there: containers are named by a UUID or, for a few of the system's, by their well-known name",

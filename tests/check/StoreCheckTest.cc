@@ -243,6 +243,26 @@ TEST(StoreCheckTest, FindsEachDamageAndChangesNothing) {
     }
 }
 
+// Goal: of two containers of one identifier, the one that a running daemon serves is never moved away. Method: a daemon
+// that says either of them, another one, or nothing.
+TEST(StoreCheckTest, AsksTheDaemonWhichOneOfTwoItServes) {
+    Store store;
+    const std::string copy = store.sibling(uuid);
+    ASSERT_EQ(std::system(("cp -a " + store.data + " " + copy).c_str()), 0);
+    for (const std::string& served : {store.data, copy, std::string("/elsewhere"), std::string()}) {
+        const CheckOptions options{
+            .daemonServes = true,
+            .servedPath = [&](ContainerClass, std::uint32_t,
+                              const std::string&) { return served.empty() ? std::nullopt : std::optional(served); },
+            .pause = std::chrono::milliseconds(0)};
+        const auto findings = store.check(options);
+        ASSERT_EQ(findings.size(), 1U) << textOf(findings);
+        const bool known = served == store.data || served == copy;
+        EXPECT_EQ(findings[0].what.find("does not say") == std::string::npos, known) << findings[0].what;
+        EXPECT_FALSE(served.ends_with(findings[0].path)) << findings[0].path;
+    }
+}
+
 // Goal: what is given away by an owner is seen, where there are owners. Method: as root, another owner.
 TEST(StoreCheckTest, FindsWhatChangedItsOwner) {
     if (::geteuid() != 0)

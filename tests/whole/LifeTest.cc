@@ -252,6 +252,25 @@ TEST(Tool, ChecksAndRepairs) {
     expectCall(daemon, {{"explain", "subdirectory-missing"}, 0, "Consequence"});
     expectCall(daemon, {{"check", "--dry-run"}, 2, "--repair"});
     expectCall(daemon, {{"--root", "/nowhere", "--json", "check"}, 5, "\"local\""});
+    // Beside a copy, in whichever order the directory lists them, the one that is served stays.
+    const std::string live = std::filesystem::path(documents).parent_path();
+    const std::string copy = live.substr(0, live.rfind('/')) + "/01234567-89AB-4DEF-8123-456789ABCDEF";
+    for (const bool copyIsNewer : {false, true}) {
+        std::filesystem::rename(live, copy);
+        ASSERT_EQ(runProgram({"/bin/cp", "-a", copy, live}).exitStatus, 0);
+        if (copyIsNewer) {
+            std::filesystem::rename(copy, copy + "x");
+            ASSERT_EQ(runProgram({"/bin/cp", "-a", copy + "x", copy}).exitStatus, 0);
+            std::filesystem::remove_all(copy + "x");
+        }
+        const auto checked = daemon.tool({"check"});
+        EXPECT_NE(checked.output.find("which clients are given"), std::string::npos) << checked.output;
+        const std::size_t command = checked.output.find("(cd -P");
+        ASSERT_NE(command, std::string::npos) << checked.output;
+        EXPECT_EQ(std::system(checked.output.substr(command, checked.output.find('\n', command) - command).c_str()), 0);
+        EXPECT_TRUE(std::filesystem::exists(live));
+        EXPECT_EQ(daemon.client().createOrLookup(dataContainer("a.b")).value().path, live);
+    }
     daemon.kill();
     expectCall(daemon, {{"check"}, 0, "The store is whole"});
     std::filesystem::remove(documents);

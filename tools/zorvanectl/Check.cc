@@ -7,6 +7,7 @@
 #include "check/StoreCheck.h"
 
 #include <algorithm>
+#include <memory>
 
 namespace zorvanectl {
 
@@ -25,6 +26,22 @@ bool isNote(const Finding& finding) {
     return zor::check::pageOf(finding.code).isNote;
 }
 
+/// Connects when it is first asked.
+decltype(CheckOptions::servedPath) servedPathOf(const zorvane::ConnectOptions& connect) {
+    return [connect, client = std::make_shared<std::optional<zorvane::Client>>()](
+               zor::ContainerClass containerClass, std::uint32_t user,
+               const std::string& identifier) -> std::optional<std::string> {
+        if (!*client)
+            if (auto connected = zorvane::Client::connect(connect))
+                *client = std::move(*connected);
+        if (!*client)
+            return std::nullopt;
+        const auto container = (*client)->createOrLookup(
+            {.containerClass = static_cast<std::uint64_t>(containerClass), .user = user, .identifier = identifier});
+        return container ? std::optional(container->path) : std::nullopt;
+    };
+}
+
 CheckOptions optionsFor(const CheckedSystem& system, const zorvane::ConnectOptions& connect) {
     CheckOptions options;
     // Asking where nobody serves would have the service manager start a daemon.
@@ -37,6 +54,7 @@ CheckOptions optionsFor(const CheckedSystem& system, const zorvane::ConnectOptio
     if (!status)
         return options;
     options.daemonServes = true;
+    options.servedPath = servedPathOf(quick);
     for (const PendingChange& change : pendingChangesIn(*status))
         options.changingProtection.insert(change.uuid);
     return options;
