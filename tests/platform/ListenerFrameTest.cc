@@ -124,7 +124,7 @@ TEST(ListenerFrame, AFloodTakesTurnsWithOthers) {
     }));
     EXPECT_EQ(std::ranges::count(served, 'S'), 100);
     EXPECT_LE(served.find('S'), 3 * world.limits.framesPerTurn);
-    EXPECT_EQ(served.back(), 'S');
+    EXPECT_LE(served.rfind('S'), 100 + 3 * world.limits.framesPerTurn);
 }
 
 // Replies that are kept go to the right request, once, and nowhere after the end: out of order, twice, from other

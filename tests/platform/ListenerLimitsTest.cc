@@ -100,8 +100,8 @@ TEST(ListenerLimits, SharesByUser) {
             accounts.push_back(account);
         return account != nullptr;
     };
-    // One user has three; all others together leave two to the owners.
-    const std::pair<uid_t, int> users[] = {{1000, 3}, {1001, 3}, {1002, 2}, {1003, 0}, {0, 2}};
+    // One user has three, and so have all that the system does not know; together they leave two to the owners.
+    const std::pair<uid_t, int> users[] = {{501, 3}, {100000, 3}, {165535, 0}, {502, 2}, {503, 0}, {0, 2}};
     for (const auto& [uid, mayHave] : users) {
         for (int i = 0; i < mayHave; ++i)
             EXPECT_TRUE(open(uid, uid == 0)) << uid;

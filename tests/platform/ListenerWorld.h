@@ -15,6 +15,7 @@
 #include <poll.h>
 #include <set>
 #include <sys/socket.h>
+#include <sys/syscall.h>
 #include <sys/un.h>
 #include <vector>
 
@@ -30,9 +31,14 @@ public:
             return nullptr;
         return std::make_unique<KernelPeer>(*this, credentials);
     }
-    bool ownsRoot(uid_t) const override { return everybodyOwnsRoot; }
+    bool ownsRoot(uid_t uid) const override { return everybodyOwnsRoot || uid == owner_; }
 
     bool everybodyOwnsRoot = true;
+    /// Nobody else then.
+    void ownersAre(uid_t uid) {
+        everybodyOwnsRoot = false;
+        owner_ = uid;
+    }
     std::atomic<bool> knowsPeers{true};
     /// What every peer is granted.
     std::atomic<bool> kernelAgent{false};
@@ -59,6 +65,8 @@ private:
         KernelIdentity& owner_;
         const ucred credentials_;
     };
+
+    uid_t owner_ = static_cast<uid_t>(-1);
 };
 
 /// A directory for a socket, which has a path of so many bytes there.
@@ -282,6 +290,13 @@ public:
     }
     std::string socketPath() const { return directory_.socketPath(); }
     RawClient connect() const { return RawClient(socketPath()); }
+    /// As another user, when the test is root: the kernel tells the effective uid of the thread that connects.
+    RawClient connectAs(uid_t uid) const {
+        (void)::syscall(SYS_setresuid, -1, uid, -1);
+        RawClient client(socketPath());
+        (void)::syscall(SYS_setresuid, -1, 0, -1);
+        return client;
+    }
     std::vector<RawClient> connect(std::size_t count) const {
         std::vector<RawClient> clients;
         while (clients.size() < count)

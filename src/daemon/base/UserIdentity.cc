@@ -3,11 +3,6 @@
 
 namespace zor {
 
-namespace {
-/// Clients up to this uid belong to the system and may act for other users; the ones above only as themselves.
-constexpr std::uint32_t lastSystemClientUserId = 500;
-} // namespace
-
 bool userIdIsValidForClass(ContainerClass containerClass, std::uint32_t userId) {
     if (isBundleClass(containerClass))
         return userId == bundleOwnerUserId;

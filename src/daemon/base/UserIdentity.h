@@ -6,6 +6,7 @@
 #include "daemon/base/Result.h"
 #include "platform/Mutex.h"
 #include "platform/Queries.h"
+#include "platform/UserNumbers.h"
 
 #include <atomic>
 #include <cstdint>
@@ -16,8 +17,6 @@ namespace zor {
 inline constexpr std::uint32_t currentUserPlaceholder = 1;
 inline constexpr std::uint32_t bundleOwnerUserId = 33;
 inline constexpr std::uint32_t systemOwnerUserId = 499;
-inline constexpr std::uint32_t firstMobileUserId = 501;
-inline constexpr std::uint32_t lastMobileUserId = 510;
 
 /// Whether `userId` may own containers of the class. Classes outside 1 to 13 have no owner.
 [[nodiscard]] bool userIdIsValidForClass(ContainerClass containerClass, std::uint32_t userId);

@@ -16,8 +16,8 @@ namespace zor::platform {
 
 namespace {
 
-/// Connections taken in a row before the thread looks for requests again.
-constexpr unsigned acceptsPerTurn = 64;
+/// Connections taken in a row before others have their turn.
+constexpr unsigned acceptsPerTurn = 16;
 /// How long nobody is accepted when there is not one descriptor left.
 constexpr std::chrono::milliseconds acceptPause{100};
 
@@ -27,7 +27,7 @@ constexpr std::chrono::milliseconds acceptPause{100};
 class LinuxServiceListener::Acceptance final : public ListenerTask {
 public:
     Acceptance(int socket, PeerIdentity& identity, ListenerCore& core)
-        : socket_(socket), identity_(identity), core_(core) {}
+        : ListenerTask(&line_), socket_(socket), identity_(identity), core_(core) {}
 
     void run(ListenerScratch&, std::uint32_t) override {
         for (unsigned i = 0; i < acceptsPerTurn; ++i) {
@@ -89,6 +89,8 @@ private:
             core_.charges.closeConnection(*account);
     }
 
+    /// Taking turns with the users, whoever connects over and over.
+    ListenerLine line_{false, 1};
     const int socket_;
     PeerIdentity& identity_;
     ListenerCore& core_;

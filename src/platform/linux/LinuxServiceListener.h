@@ -6,6 +6,7 @@
 //
 // ListenerAcceptor      who gets in                 ListenerConnection   one peer: frames in, replies out
 // ListenerPool          the threads, one epoll      ListenerInput/Output its buffers
+// ListenerTurns         whose turn it is
 // ListenerCharges       who uses how much           ListenerIncidents    what is counted and logged
 // PassedAlong           descriptors sent by peers
 #pragma once

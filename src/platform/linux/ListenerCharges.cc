@@ -1,6 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/linux/ListenerCharges.h"
 
+#include "platform/UserNumbers.h"
+
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 
@@ -19,7 +22,6 @@ void mustHold(bool condition, const char* what) {
 
 ListenerCharges::~ListenerCharges() {
     const MutexLock lock(mutex_);
-    mustHold(accounts_.empty(), "an account is still open");
     mustHold(totals_.connections == 0, "connections do not balance");
     mustHold(totals_.inputBytes == 0, "input bytes do not balance");
     mustHold(totals_.outputBytes == 0, "output bytes do not balance");
@@ -31,17 +33,12 @@ ListenerCharges::Account* ListenerCharges::openConnection(uid_t uid, bool ownsRo
     const MutexLock lock(mutex_);
     if (totals_.connections >= limits_.connectionsMax)
         return nullptr;
-    const std::size_t kept = limits_.connectionsKeptForOwners;
-    const auto found = accounts_.find(uid);
-    if (!ownsRoot) {
-        if (ofOthers_.connections + kept >= limits_.connectionsMax)
-            return nullptr;
-        if (found != accounts_.end() && found->second.connections >= limits_.connectionsMaxPerUser)
-            return nullptr;
-    }
-    Account& account = found != accounts_.end()
-                           ? found->second
-                           : accounts_.emplace(uid, Account{.uid = uid, .ownsRoot = ownsRoot}).first->second;
+    if (!ownsRoot && ofOthers_.connections + limits_.connectionsKeptForOwners >= limits_.connectionsMax)
+        return nullptr;
+    const unsigned threadsMax = ownsRoot ? limits_.threadsMax : std::min(limits_.threadsMaxPerUser, limits_.threadsMax);
+    Account& account = accounts_.try_emplace(ownsRoot ? uid : countedUserId(uid), ownsRoot, threadsMax).first->second;
+    if (!ownsRoot && account.connections >= limits_.connectionsMaxPerUser)
+        return nullptr;
     if (!ownsRoot)
         ++ofOthers_.connections;
     ++account.connections;
@@ -60,7 +57,6 @@ void ListenerCharges::closeConnection(Account& account) {
         return;
     mustHold(account.inputBytes == 0, "a user's input bytes do not balance");
     mustHold(account.outputBytes == 0, "a user's output bytes do not balance");
-    accounts_.erase(account.uid);
 }
 
 bool ListenerCharges::changeInput(Account& account, std::size_t before, std::size_t after) {

@@ -1,12 +1,14 @@
 // SPDX-License-Identifier: Apache-2.0
 // Who uses how much of the listener: connections and buffered bytes, counted for each user and in all.
 //
-// Every charge is given back by the object that took it; when the last account closes everything is zero again, and the
+// Users that the system does not know count as one (UserNumbers.h). So there are so few accounts that they stay for the
+// listener's life. Every charge is given back by the object that took it; at the end everything is zero again, and the
 // destructor stops the process if it is not. Any thread.
 #pragma once
 
 #include "platform/Mutex.h"
 #include "platform/linux/ListenerLimits.h"
+#include "platform/linux/ListenerTurns.h"
 
 #include <cstddef>
 #include <map>
@@ -21,11 +23,13 @@ public:
     ListenerCharges(const ListenerCharges&) = delete;
     ListenerCharges& operator=(const ListenerCharges&) = delete;
 
-    /// One user's share. Lives as long as the user has a connection.
+    /// One user's share. Lives as long as this object.
     struct Account {
-        // These two may be read without the mutex.
-        const uid_t uid = 0;
-        const bool ownsRoot = false;
+        Account(bool isOwners, unsigned threadsMax) : ownsRoot(isOwners), line(isOwners, threadsMax) {}
+
+        const bool ownsRoot;
+        /// The mutex does not guard it.
+        ListenerLine line;
         std::size_t connections = 0;
         std::size_t inputBytes = 0;
         std::size_t outputBytes = 0;
@@ -50,6 +54,7 @@ public:
 private:
     const ListenerLimits limits_;
     mutable Mutex mutex_;
+    /// By countedUserId, but for owners of the root.
     std::map<uid_t, Account> accounts_ ZOR_GUARDED_BY(mutex_);
     Totals totals_ ZOR_GUARDED_BY(mutex_);
     /// What those have of it who do not own the root.

@@ -54,6 +54,8 @@ void ListenerConnection::open(PeerSocket socket, std::unique_ptr<Peer> peer, Lis
         input_.open(core_.charges, account, peer->pid());
         output_.open(core_.charges, account, core_.limits.outputBytesMax);
         account_ = &account;
+        uid_ = peer->kernelUserId();
+        standIn(account.line);
         peer_ = std::move(peer);
         descriptor_ = socket.get();
         socket_ = std::move(socket);
@@ -102,9 +104,9 @@ void ListenerConnection::run(ListenerScratch& scratch, std::uint32_t events) {
 }
 
 ListenerConnection::Outcome ListenerConnection::serve(ListenerScratch& scratch) {
-    unsigned framesLeft = core_.limits.framesPerTurn;
+    Turn turn;
     for (;;) {
-        if (const std::optional<Outcome> outcome = serveArrived(scratch, framesLeft))
+        if (const std::optional<Outcome> outcome = serveArrived(scratch, turn))
             return *outcome;
         if (output_.pendingBytes() >= core_.limits.outputBytesPaused)
             return Outcome::wait;
@@ -123,12 +125,22 @@ ListenerConnection::Outcome ListenerConnection::serve(ListenerScratch& scratch) 
         if (input_.filled())
             continue;
         // Probably that was all; if not, arming says so at once, after others have had their turn.
-        return serveArrived(scratch, framesLeft).value_or(Outcome::wait);
+        return serveArrived(scratch, turn).value_or(Outcome::wait);
     }
 }
 
-std::optional<ListenerConnection::Outcome> ListenerConnection::serveArrived(ListenerScratch& scratch,
-                                                                            unsigned& framesLeft) {
+bool ListenerConnection::isOver(Turn& turn) const {
+    if (turn.frames == 0)
+        return false;
+    if (turn.frames >= core_.limits.framesPerTurn || core_.pool.othersWait(line()))
+        return true;
+    const auto now = std::chrono::steady_clock::now();
+    if (turn.frames == 1)
+        turn.firstServed = now;
+    return now - turn.firstServed >= core_.limits.turnMax;
+}
+
+std::optional<ListenerConnection::Outcome> ListenerConnection::serveArrived(ListenerScratch& scratch, Turn& turn) {
     for (;;) {
         if (over_)
             return Outcome::end;
@@ -142,9 +154,9 @@ std::optional<ListenerConnection::Outcome> ListenerConnection::serveArrived(List
             return std::nullopt;
         if (output_.pendingBytes() >= core_.limits.outputBytesPaused)
             return Outcome::wait;
-        if (framesLeft == 0)
+        if (isOver(turn))
             return Outcome::requeue;
-        --framesLeft;
+        ++turn.frames;
         if (!serveFrame(header, pending.subspan(ipc::frameHeaderBytes, header.payloadBytes)))
             return endWithOther(ListenerIncident::brokenFrame);
         input_.consume(ipc::frameHeaderBytes + header.payloadBytes);
@@ -294,7 +306,7 @@ void ListenerConnection::transmit(Channel& channel, plist::Data& frame) {
             dropLocked();
         return;
     case ListenerOutput::Result::tooMuch:
-        core_.incidents.happened(ListenerIncident::tooMuchOutput, static_cast<std::int64_t>(account_->uid));
+        core_.incidents.happened(ListenerIncident::tooMuchOutput, static_cast<std::int64_t>(uid_));
         return dropLocked();
     case ListenerOutput::Result::broken:
         return dropLocked();
@@ -306,7 +318,7 @@ void ListenerConnection::unwritable(Channel& channel) {
     if (channel.sent || channel.life != life_ || !open_ || over_)
         return;
     channel.sent = true;
-    core_.incidents.happened(ListenerIncident::unwritableReply, static_cast<std::int64_t>(account_->uid));
+    core_.incidents.happened(ListenerIncident::unwritableReply, static_cast<std::int64_t>(uid_));
     // A peer that waits for this reply has to learn that it does not come.
     dropLocked();
 }

@@ -17,6 +17,7 @@
 #include "platform/linux/PassedAlong.h"
 
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <memory>
 #include <optional>
@@ -58,11 +59,19 @@ private:
         end,
     };
 
+    /// How much of its turn the connection has had.
+    struct Turn {
+        unsigned frames = 0;
+        /// Looked at when a second frame is at hand: most turns have one, and need no clock.
+        std::chrono::steady_clock::time_point firstServed;
+    };
+
     Outcome serve(ListenerScratch& scratch);
+    [[nodiscard]] bool isOver(Turn& turn) const;
     /// Keeps what has arrived of the next request, whatever the worker's scratch buffer is used for meanwhile.
     Outcome keepRest(Outcome outcome);
     /// Serves the frames that have arrived whole. nullopt when more has to be received.
-    std::optional<Outcome> serveArrived(ListenerScratch& scratch, unsigned& framesLeft);
+    std::optional<Outcome> serveArrived(ListenerScratch& scratch, Turn& turn);
     /// False when it was no request.
     bool serveFrame(const ipc::FrameHeader& header, std::span<const std::uint8_t> payload);
     Outcome endWithOther(ListenerIncident incident);
@@ -100,6 +109,7 @@ private:
     /// Closed only by the holder, who therefore may use descriptor_, the same number, without the mutex.
     PeerSocket socket_ ZOR_GUARDED_BY(mutex_);
     ListenerCharges::Account* account_ ZOR_GUARDED_BY(mutex_) = nullptr;
+    uid_t uid_ ZOR_GUARDED_BY(mutex_) = 0;
     bool open_ ZOR_GUARDED_BY(mutex_) = false;
     bool held_ ZOR_GUARDED_BY(mutex_) = false;
     /// Which of the connections that this object has been; a channel belongs to one.

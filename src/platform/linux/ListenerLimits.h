@@ -32,13 +32,18 @@ struct ListenerLimits {
     /// The same of all users that do not own the root together.
     std::size_t outputBytesMaxOfOthers = std::size_t{1} << 30;
 
-    /// Requests of one connection that are served in a row before others have their turn.
+    /// Requests of one connection that are served in a row while nobody else waits, and for how long: who comes
+    /// meanwhile is not seen before the end. The first one may take any time.
     unsigned framesPerTurn = 16;
+    std::chrono::microseconds turnMax{1000};
 
     /// Threads that run handlers at once; 0 means one for each processor, and no fewer than 2.
     unsigned threadsRunning = 0;
     /// Threads in all, those included that wait inside a handler.
     unsigned threadsMax = 64;
+    /// Requests of any one user that does not own the root under way at once: several users whose requests all wait for
+    /// ever leave threads to the others.
+    unsigned threadsMaxPerUser = 16;
     /// A thread that is not needed ends after this time.
     std::chrono::milliseconds threadIdle{5000};
     /// How long a handler may wait unannounced before another thread takes its place.

@@ -2,6 +2,7 @@
 #include "platform/linux/ListenerPool.h"
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 #include <csignal>
 #include <cstdio>
@@ -23,6 +24,8 @@ namespace {
 
 constexpr std::uint64_t phaseMask = 3;
 constexpr std::uint64_t oneTask = 4;
+/// A burst is seen in a few looks; more would be stack that is rarely used.
+constexpr std::size_t eventsPerLook = 64;
 
 /// A thread that takes no signals: those belong to the main thread. False when the system gives none, or no memory.
 bool startThreadWithoutSignals(std::thread& thread, const char* name, std::function<void()> body) {
@@ -113,8 +116,6 @@ void ListenerPool::stop() {
     for (const auto& worker : workers_)
         messagesOfEnded_ += worker->scratch.messages.load(std::memory_order_relaxed);
     workers_.clear();
-    requeued_.clear();
-    requeuedCount_ = 0;
     laterJob_ = nullptr;
 }
 
@@ -135,10 +136,13 @@ void ListenerPool::remove(int fd) {
 void ListenerPool::requeue(ListenerTask& task) {
     {
         const MutexLock lock(mutex_);
-        requeued_.push_back(&task);
-        ++requeuedCount_;
+        turns_.requeue(task);
     }
-    if (waiting_ > 0)
+    offerTurns();
+}
+
+void ListenerPool::offerTurns() {
+    if (turns_.count() > 0 && waiting_ > 0)
         wakeWaiting();
 }
 
@@ -173,53 +177,71 @@ void ListenerPool::work(Worker& worker) {
     while (!stopping_) {
         if (active_ > running_ && !parkWhileEnoughRun(worker))
             return;
-        const Ready ready = nextReady(worker);
-        if (ready.task)
-            runTask(worker, ready);
+        const Turn turn = nextTurn();
+        if (turn.task)
+            runTask(worker, turn);
     }
     // One write wakes one worker: the next one is this one's to wake.
     wakeWaiting();
 }
 
-void ListenerPool::runTask(Worker& worker, const Ready& ready) {
+void ListenerPool::runTask(Worker& worker, const Turn& turn) {
     const std::uint64_t task = (worker.state.load(std::memory_order_relaxed) & ~phaseMask) + oneTask;
     worker.state.store(task | static_cast<std::uint64_t>(Phase::working));
-    ready.task->run(worker.scratch, ready.events);
+    turn.task->run(worker.scratch, turn.events);
     const std::uint64_t last = worker.state.exchange(task | static_cast<std::uint64_t>(Phase::waiting));
     if (last == (task | static_cast<std::uint64_t>(Phase::blocked)))
         ++active_;
+    if (!turn.line->end())
+        return;
+    {
+        const MutexLock lock(mutex_);
+        turns_.callBack(*turn.line);
+    }
+    offerTurns();
 }
 
-ListenerPool::Ready ListenerPool::nextReady(Worker& worker) {
-    // Descriptors and requeued tasks take turns.
-    if (worker.requeuedFirst && requeuedCount_ > 0) {
-        worker.requeuedFirst = false;
-        if (ListenerTask* task = takeRequeued())
-            return {.task = task};
-    }
-    epoll_event event = {};
+ListenerPool::Turn ListenerPool::nextTurn() {
+    std::array<epoll_event, eventsPerLook> events; // NOLINT(*-member-init): the kernel fills what is looked at
     ++waiting_;
-    // Looked at after this worker counts as waiting: either it sees a requeued task, or who requeues it wakes this one.
-    const int timeout = requeuedCount_ > 0 ? 0 : -1;
-    const int count = ::epoll_wait(epoll_.get(), &event, 1, timeout);
+    // Looked at after this worker counts as waiting: either it sees what waits, or who lets it wait wakes this one.
+    const bool somebodyWaits = turns_.count() > 0;
+    const int count = ::epoll_wait(epoll_.get(), events.data(), events.size(), somebodyWaits ? 0 : -1);
     if (waiting_-- == 1)
         nobodyWaits();
-    if (count != 1 || event.data.ptr == nullptr)
-        return {.task = takeRequeued()};
-    worker.requeuedFirst = true;
-    return {.task = static_cast<ListenerTask*>(event.data.ptr), .events = event.events};
+    if (count == 1 && turns_.count() == 0) {
+        if (const Turn turn = turnOf(events.front()); turn.task)
+            return turn;
+    }
+    return turnAfter(std::span(events).first(static_cast<std::size_t>(std::max(count, 0))));
 }
 
-ListenerTask* ListenerPool::takeRequeued() {
-    if (requeuedCount_ == 0)
-        return nullptr;
-    const MutexLock lock(mutex_);
-    if (requeued_.empty() || stopping_)
-        return nullptr;
-    ListenerTask* task = requeued_.front();
-    requeued_.pop_front();
-    --requeuedCount_;
-    return task;
+ListenerPool::Turn ListenerPool::turnOf(const epoll_event& event) const {
+    auto* const task = static_cast<ListenerTask*>(event.data.ptr);
+    if (!task || stopping_)
+        return {};
+    ListenerLine& line = task->line();
+    return line.begin() ? Turn{.task = task, .events = event.events, .line = &line} : Turn{};
+}
+
+ListenerPool::Turn ListenerPool::turnAfter(std::span<const epoll_event> events) {
+    if (events.empty() && turns_.count() == 0)
+        return {};
+    Turn turn;
+    {
+        const MutexLock lock(mutex_);
+        for (const epoll_event& event : events) {
+            if (event.data.ptr)
+                turns_.add(*static_cast<ListenerTask*>(event.data.ptr), event.events);
+        }
+        if (stopping_)
+            return {};
+        // A full look may have left some out, among them one whose turn comes first.
+        if (events.size() < eventsPerLook)
+            turn = turns_.take();
+    }
+    offerTurns();
+    return turn;
 }
 
 bool ListenerPool::parkWhileEnoughRun(Worker& worker) {
@@ -418,7 +440,7 @@ void ListenerPool::makeUpForStuckWorkers() {
 
 bool ListenerPool::workIsReady() const {
     pollfd epoll = {.fd = epoll_.get(), .events = POLLIN, .revents = 0};
-    return requeuedCount_ > 0 || ::poll(&epoll, 1, 0) > 0;
+    return turns_.count() > 0 || ::poll(&epoll, 1, 0) > 0;
 }
 
 bool ListenerPool::isStuck(Worker& worker) const {

@@ -13,7 +13,9 @@
 //   - whenever fewer are active than may run, at least one is waiting, or the pool has threadsMax threads: so work that
 //     arrives is always seen by somebody. Whoever makes "nobody waits" or "fewer are active" true looks at the other
 //     and adds a worker; both counters are sequentially consistent, so one of two that meet sees it;
-//   - an armed descriptor wakes one worker. A task may still be called for an event that is out of date, or while
+//   - an armed descriptor wakes one worker, and whoever leaves tasks waiting for their turn (ListenerTurns.h) wakes one
+//   that
+//     has nothing to do. A task may still be called for an event that is out of date, or while
 //   another
 //     worker has it (after a rearm from outside): it has to tell that itself.
 // The watcher is a thread that ticks while nobody waits, and until no receive is under way, and else sleeps without a
@@ -25,14 +27,16 @@
 #include "platform/FileDescriptor.h"
 #include "platform/Mutex.h"
 #include "platform/linux/ListenerLimits.h"
+#include "platform/linux/ListenerTurns.h"
 #include "platform/linux/PassedAlong.h"
 
 #include <atomic>
 #include <chrono>
 #include <cstdint>
-#include <deque>
 #include <functional>
 #include <memory>
+#include <span>
+#include <sys/epoll.h>
 #include <sys/types.h>
 #include <thread>
 #include <vector>
@@ -46,14 +50,6 @@ struct ListenerScratch {
     std::atomic<std::uint64_t> messages{0};
     /// Set around each receive, so that nothing a peer passed along holds the worker there.
     ReceivingMark receiving;
-};
-
-class ListenerTask {
-public:
-    virtual ~ListenerTask() = default;
-    /// The epoll events that came, or 0 after a requeue. The task arms its descriptor again when it is done. It throws
-    /// nothing: the thread serves others too.
-    virtual void run(ListenerScratch& scratch, std::uint32_t events) = 0;
 };
 
 class ListenerPool {
@@ -73,9 +69,10 @@ public:
     [[nodiscard]] bool rearm(int fd, ListenerTask& task, std::uint32_t events);
     void remove(int fd);
 
-    /// Has the task called again, after others that are ready. From a task. Throws std::bad_alloc, and does not have it
-    /// called then.
+    /// Has the task called again, in the turn of its line. From a task.
     void requeue(ListenerTask& task);
+    /// Whether somebody else than this line waits for a turn, as far as is known. From a task.
+    [[nodiscard]] bool othersWait(const ListenerLine& line) const { return turns_.othersWait(line); }
     /// Runs `job` on the watcher's thread after the delay. At most one is pending; a second call replaces it.
     void callLater(std::chrono::milliseconds delay, std::function<void()> job);
 
@@ -107,19 +104,21 @@ private:
         std::uint64_t stateSeen = 0;
         std::chrono::nanoseconds cpuTimeSeen{0};
         unsigned blockingDepth = 0;
-        bool requeuedFirst = false;
         ListenerScratch scratch;
     };
-    struct Ready {
-        ListenerTask* task = nullptr;
-        std::uint32_t events = 0;
-    };
+    using Turn = ListenerTurns::Turn;
 
     void work(Worker& worker);
-    void runTask(Worker& worker, const Ready& ready);
+    void runTask(Worker& worker, const Turn& turn);
     /// No task when the pool stops or there was nothing after all.
-    Ready nextReady(Worker& worker);
-    ListenerTask* takeRequeued();
+    Turn nextTurn();
+    /// The task of an event that came alone, while none waited; no task when there is none, or its line is at its
+    /// share.
+    Turn turnOf(const epoll_event& event) const;
+    /// Lets what has come wait, and takes the next one.
+    Turn turnAfter(std::span<const epoll_event> events);
+    /// After a change of what waits: there is a worker for it that looks.
+    void offerTurns();
     /// False: this thread was not needed for a while, is no worker any more, and has to return.
     bool parkWhileEnoughRun(Worker& worker);
     /// Makes one more worker active, if fewer are than may run.
@@ -153,15 +152,15 @@ private:
     std::atomic<bool> stopping_{false};
     std::atomic<unsigned> waiting_{0};
     std::atomic<unsigned> active_{0};
-    std::atomic<unsigned> requeuedCount_{0};
     /// Whether the watcher ticks. Only its own look at `waiting_` ends that.
     std::atomic<bool> watching_{false};
 
     mutable Mutex mutex_;
+    /// Changed under the mutex.
+    ListenerTurns turns_;
     /// No worker comes or goes once the pool is stopping.
     std::vector<std::unique_ptr<Worker>> workers_ ZOR_GUARDED_BY(mutex_);
     std::vector<std::unique_ptr<Worker>> ended_ ZOR_GUARDED_BY(mutex_);
-    std::deque<ListenerTask*> requeued_ ZOR_GUARDED_BY(mutex_);
     unsigned parked_ ZOR_GUARDED_BY(mutex_) = 0;
     /// Parked workers that were called back and have not woken yet.
     unsigned called_ ZOR_GUARDED_BY(mutex_) = 0;
