@@ -11,7 +11,8 @@
 namespace zor::platform {
 namespace {
 
-// A peer is what the registry says of its program, and stops being that: by executing another one, by exiting.
+// A peer is what the registry says of its program, and stops being that: by executing another one, registered or not,
+// by exiting.
 TEST(PeerIdentity, EndsWithTheProgramAndTheProcess) {
     PeerWorld world;
     world.registerAs("a.plist", "agent", "agent", "<key>Entitlements</key><dict><key>k</key><true/></dict>");
@@ -28,12 +29,17 @@ TEST(PeerIdentity, EndsWithTheProgramAndTheProcess) {
     EXPECT_EQ(peer->identify(Peer::Explain::no).grant, first.grant) << "an unchanged peer gets the same object";
     EXPECT_EQ(peer->identify(Peer::Explain::yes).explanation, "a.plist: matches");
     process.execute(world.program("sleeper"));
-    EXPECT_EQ(who(*peer), "sleeper");
-    process.kill();
-    EXPECT_TRUE(eventually([&] { return who(*peer) == "-"; })) << "a process that has ended, though not yet waited for";
-    process.end();
     EXPECT_EQ(who(*peer), "-");
-    EXPECT_EQ(peer->identify(Peer::Explain::yes).explanation, "the process has ended");
+    EXPECT_EQ(peer->identify(Peer::Explain::yes).explanation,
+              "the process has executed another program since it connected");
+    PeerProcess ends(world.server, world.program("agent"));
+    const auto ending = world.peerOf(ends);
+    EXPECT_EQ(who(*ending), "agent");
+    ends.kill();
+    EXPECT_TRUE(eventually([&] { return who(*ending) == "-"; })) << "one that has ended, though not yet waited for";
+    ends.end();
+    EXPECT_EQ(who(*ending), "-");
+    EXPECT_EQ(ending->identify(Peer::Explain::yes).explanation, "the process has ended");
     const PeerProcess stranger(world.server, world.program("other"));
     const auto unknown = world.peerOf(stranger);
     EXPECT_EQ(who(*unknown), "-");

@@ -57,6 +57,8 @@ struct PeerStart {
     std::string runs = {};
     /// The number that it is to have.
     pid_t number = 0;
+    /// With one, the program is not the shell but one that takes this.
+    const char* argument = nullptr;
 };
 
 /// A process that connects and then becomes `shell`, a copy of /bin/sh; the connection stays open in it.
@@ -71,6 +73,8 @@ public:
             const bool ready = (start.uid == ::geteuid() || ::setresuid(start.uid, start.uid, start.uid) == 0) &&
                                (!start.prepare || start.prepare()) &&
                                (start.connects == PeerStart::Connects::no || server.connect(connection.get()) == 0);
+            if (ready && start.argument)
+                ::execl(shell.c_str(), shell.c_str(), start.argument, nullptr);
             if (ready && ::dup3(ends[0], 0, 0) == 0)
                 ::execl(shell.c_str(), shell.c_str(), "-c", "read next && exec \"$next\" 1000", nullptr);
             ::_exit(1);

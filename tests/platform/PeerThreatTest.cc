@@ -1,10 +1,12 @@
 // SPDX-License-Identifier: Apache-2.0
-// Ways in which a process could pass for another: a mount namespace of its own, the number of one that has ended.
+// Ways in which a process could pass for another: a mount namespace of its own, the number of one that has ended or of
+// another pid namespace, a set-ID program executed on a connection.
 // "agent" is registered, "other" is not.
 #include "platform/PeerProcess.h"
 
 #include <sched.h>
 #include <sys/mount.h>
+#include <sys/prctl.h>
 
 namespace zor::platform {
 namespace {
@@ -62,6 +64,65 @@ TEST(PeerThreat, ANumberThatIsUsedAgain) {
         EXPECT_EQ(peer->pid(), number);
         EXPECT_EQ(who(*peer), "-");
     }
+}
+
+// A set-group-ID program that is executed after the connect, though before the accept, has no powers on that
+// connection; one that ran before has, also when it gave its group up first.
+TEST(PeerThreat, AProgramThatGivesAGroup) {
+    constexpr uid_t user = 501;
+    constexpr gid_t given = 499;
+    if (::geteuid() != 0)
+        GTEST_SKIP() << "needs root: a program of another group";
+    PeerWorld world;
+    world.registerAs("sleeper.plist", "sleeper", "sleeper");
+    ASSERT_EQ(::chown(world.program("sleeper").c_str(), 0, given), 0);
+    ASSERT_EQ(::chmod(world.program("sleeper").c_str(), 02755), 0);
+    const auto judged = [&](const std::function<bool()>& prepare) {
+        const PeerProcess process(world.server, world.program("sleeper"),
+                                  {.uid = user, .prepare = prepare, .argument = "1000"});
+        return who(*world.peerOf(process));
+    };
+    EXPECT_EQ(judged({}), "-");
+    EXPECT_EQ(judged([] { return ::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) == 0; }), "sleeper");
+    // Who has no capability keeps no group of before but this one.
+    const PeerProcess process(world.server, world.program("sleeper"),
+                              {.prepare = [] { return ::setresgid(given, given, given) == 0; }, .argument = "1000"});
+    EXPECT_EQ(who(*world.peerOf(process)), "sleeper");
+}
+
+// Numbers of another pid namespace are nobody's: the first process of one, which sees the /proc of outside, is not the
+// first process there.
+TEST(PeerThreat, NumbersOfAnotherPidNamespace) {
+    enum { isNobody, isSomebody, cannot };
+    PeerWorld world;
+    std::error_code ignored;
+    const std::string first = std::filesystem::read_symlink("/proc/1/exe", ignored);
+    world.test.replace(PeerWorld::pathOf("first.plist"),
+                       "<plist version=\"1.0\"><dict><key>Executable</key><string>" + first +
+                           "</string><key>Identifier</key><string>first</string></dict></plist>");
+    const auto outcomeOf = [](pid_t child) {
+        int status = 0;
+        ::waitpid(child, &status, 0);
+        return WIFEXITED(status) ? WEXITSTATUS(status) : cannot;
+    };
+    const pid_t outer = ::fork();
+    if (outer == 0) {
+        if (::geteuid() != 0 || ::unshare(CLONE_NEWPID) != 0)
+            ::_exit(cannot);
+        const pid_t inner = ::fork();
+        if (inner > 0)
+            ::_exit(outcomeOf(inner));
+        const FileDescriptor client(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+        if (LinuxPeerIdentity::procIsOurs() || world.server.connect(client.get()) != 0)
+            ::_exit(isSomebody);
+        const FileDescriptor accepted = world.server.accept();
+        const auto peer = world.identity.peerOfSocket(accepted.get());
+        ::_exit(!peer || who(*peer) == "-" ? isNobody : isSomebody);
+    }
+    const int outcome = outcomeOf(outer);
+    if (outcome == cannot)
+        GTEST_SKIP() << "needs root and pid namespaces";
+    EXPECT_EQ(outcome, isNobody);
 }
 
 } // namespace

@@ -11,9 +11,12 @@
 #include <future>
 #include <gtest/gtest.h>
 #include <random>
+#include <sched.h>
 #include <set>
 #include <sys/resource.h>
+#include <sys/wait.h>
 #include <thread>
+#include <unistd.h>
 
 namespace zor::whole {
 
@@ -35,6 +38,26 @@ TEST(Life, SecondDaemonAndSigtermAndBrokenCommandLines) {
         words.insert(words.end(), arguments.begin(), arguments.end());
         EXPECT_EQ(runProgram(words).exitStatus, status) << arguments[0];
     }
+}
+
+// Goal: a daemon that would take its clients for other processes does not start, and says why. Method: the /proc of
+// outside in a pid namespace of its own.
+TEST(Life, TheProcOfAnotherPidNamespace) {
+    constexpr int cannot = 99;
+    const DaemonProcess place;
+    Program daemon({programPath("zorvaned"), "--root", place.root()}, [] {
+        const pid_t inner = ::unshare(CLONE_NEWPID) == 0 ? ::fork() : -1;
+        int status = 0;
+        if (inner != 0)
+            ::_exit(::waitpid(inner, &status, 0) == inner ? WEXITSTATUS(status) : cannot);
+        ::alarm(10);
+        return true;
+    });
+    if (daemon.wait() == cannot)
+        GTEST_SKIP() << "needs root and pid namespaces";
+    EXPECT_NE(daemon.said().find("zorvaned: /proc is not mounted or belongs to another pid namespace"),
+              std::string::npos)
+        << daemon.said();
 }
 
 // Goal: a file that may not grow any further is an error that is told, by the daemon and by the tool, and no end.

@@ -32,26 +32,27 @@ Identity LinuxPeer::identify(Explain explain) {
     registry_.lookIfDue();
     Identity identity{
         .pid = accepted_.pid, .effectiveUserId = accepted_.reportedUserId, .grant = nullptr, .explanation = {}};
-    const auto now = executable();
-    if (!now) {
+    const auto now = executableOf(accepted_.process.get());
+    hasExecutedAnother_ = hasExecutedAnother_ || (now && !isAsAccepted(*now));
+    if (!now || hasExecutedAnother_) {
         judgedGeneration_ = 0;
         judgedGrant_ = nullptr;
         if (explain == Explain::yes)
-            identity.explanation = whyUnexamined(now.error());
+            identity.explanation =
+                now ? "the process has executed another program since it connected" : whyUnexamined(now.error());
         return identity;
     }
-    if (explain == Explain::no && *now == judgedExecutable_ && registry_.generation() == judgedGeneration_) {
+    if (explain == Explain::no && registry_.generation() == judgedGeneration_) {
         identity.grant = judgedGrant_;
         return identity;
     }
     registry_.takeNotices();
     auto snapshot = registry_.snapshot();
-    Judgement judgement = judge(*snapshot, *now);
+    Judgement judgement = judge(*snapshot, now->id);
     if (!judgement.named && registry_.lookAgain()) {
         snapshot = registry_.snapshot();
-        judgement = judge(*snapshot, *now);
+        judgement = judge(*snapshot, now->id);
     }
-    judgedExecutable_ = *now;
     judgedGeneration_ = judgement.decided ? snapshot->generation : 0;
     judgedGrant_ = judgement.grant;
     identity.grant = std::move(judgement.grant);
@@ -60,13 +61,32 @@ Identity LinuxPeer::identify(Explain explain) {
     return identity;
 }
 
-std::expected<FileId, int> LinuxPeer::executable() const {
+std::expected<LinuxPeer::Executable, int> LinuxPeer::executableOf(int process) {
     struct statx status{};
     // The link is one of the kernel's: following it leads to the file that runs, whatever its name is or was. What
     // tells it apart never changes, so a file system that a server keeps, maybe the peer's own, need not be asked.
-    if (::statx(accepted_.process.get(), executableLink, AT_STATX_DONT_SYNC, STATX_INO, &status) != 0)
+    if (::statx(process, executableLink, AT_STATX_DONT_SYNC, STATX_INO | STATX_MODE | STATX_UID | STATX_GID, &status) !=
+        0)
         return std::unexpected(errno);
-    return FileId{.device = makedev(status.stx_dev_major, status.stx_dev_minor), .inode = status.stx_ino};
+    return Executable{.id = {.device = makedev(status.stx_dev_major, status.stx_dev_minor), .inode = status.stx_ino},
+                      .givesUser = (status.stx_mode & S_ISUID) != 0,
+                      .givesGroup = (status.stx_mode & S_ISGID) != 0,
+                      .uid = status.stx_uid,
+                      .gid = status.stx_gid};
+}
+
+bool LinuxPeer::isAsAccepted(const Executable& now) const {
+    if (now.id != accepted_.executable)
+        return false;
+    const bool mayHaveUser = now.givesUser && now.uid != accepted_.uid;
+    const bool mayHaveGroup = now.givesGroup && now.gid != accepted_.gid;
+    if (!mayHaveUser && !mayHaveGroup)
+        return true;
+    // The directory belongs to the process's effective user and group, whatever hides the rest of it. A program may
+    // have dropped what its file gave it before it connected.
+    struct statx process{};
+    return ::statx(accepted_.process.get(), "", AT_EMPTY_PATH, STATX_UID | STATX_GID, &process) == 0 &&
+           !(mayHaveUser && process.stx_uid == now.uid) && !(mayHaveGroup && process.stx_gid == now.gid);
 }
 
 LinuxPeer::Judgement LinuxPeer::judge(const IdentityRegistry::Snapshot& snapshot, const FileId& executable) const {

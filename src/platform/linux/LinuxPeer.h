@@ -2,10 +2,17 @@
 // One connected process, pinned: the descriptor of its /proc directory stays with that very process, so nobody who is
 // given its pid later is taken for it.
 //
-// Per message, while nothing changed: one fstatat of "exe" (which file the process runs now) and two comparisons. When
-// the process has executed something else, or the registry has changed, it is judged anew. Whatever cannot be examined
-// (the process has ended, or belongs to somebody whom a daemon that is not root may not look at) is granted nothing.
-// One thread at a time.
+// Per message, while nothing changed: one statx of "exe" (which file the process runs now) and a few comparisons. When
+// the registry has changed, it is judged anew. A process that has executed another file since it was accepted is
+// granted nothing, and never again: what it sends now may have been begun by the program of before. The same file
+// executed again changes nothing, unless it has a set-ID bit and gives a user or group that the process did not connect
+// with; that is looked at for such files alone, and there it tells also of a program that was executed between the
+// connect and the accept. Whatever cannot be examined (the process has ended, or belongs to somebody whom a daemon that
+// is not root may not look at) is granted nothing.
+//
+// Not told apart: a program without set-ID bits that is executed before the accept, and one that executes another,
+// which executes it again, between two messages. Both run under the uid that connected, and to whoever has that uid
+// their powers are open anyway. One thread at a time.
 #pragma once
 
 #include "platform/FileDescriptor.h"
@@ -20,14 +27,29 @@ namespace zor::platform {
 
 class LinuxPeer final : public Peer {
 public:
+    /// A file that a process runs.
+    struct Executable {
+        FileId id;
+        bool givesUser = false;
+        bool givesGroup = false;
+        uid_t uid = 0;
+        gid_t gid = 0;
+    };
+    /// What a process runs, by its /proc directory; or the errno of the look.
+    [[nodiscard]] static std::expected<Executable, int> executableOf(int process);
+
     /// What the kernel said when the connection was accepted.
     struct Accepted {
         pid_t pid = 0;
+        // Effective ones, of the moment of the connect.
         uid_t uid = 0;
+        gid_t gid = 0;
         /// The uid as the daemon reports it.
         std::uint32_t reportedUserId = 0;
         /// /proc/PID, certain to be the process that connected; invalid when that one had ended.
         FileDescriptor process;
+        /// Absent when it could not be examined.
+        std::optional<FileId> executable;
         std::optional<std::string> securityLabel;
     };
     LinuxPeer(Accepted accepted, IdentityRegistry& registry) : accepted_(std::move(accepted)), registry_(registry) {}
@@ -37,8 +59,8 @@ public:
     [[nodiscard]] uid_t kernelUserId() const override { return accepted_.uid; }
 
 private:
-    /// What the process runs, or the errno of the look.
-    [[nodiscard]] std::expected<FileId, int> executable() const;
+    /// Whether this is what it ran when it was accepted, with the user and group that it connected with.
+    [[nodiscard]] bool isAsAccepted(const Executable& now) const;
     struct Judgement {
         std::shared_ptr<const IdentityGrant> grant;
         /// An entry names the executable, whether it matched or not.
@@ -57,8 +79,8 @@ private:
 
     const Accepted accepted_;
     IdentityRegistry& registry_;
-    // The last judgement, and what it rests on.
-    FileId judgedExecutable_;
+    bool hasExecutedAnother_ = false;
+    // The last judgement, and the generation that it rests on.
     std::uint64_t judgedGeneration_ = 0;
     std::shared_ptr<const IdentityGrant> judgedGrant_;
 };

@@ -14,6 +14,10 @@ public:
     LinuxPeerIdentity(IdentityRegistry& registry, uid_t daemonUserId)
         : registry_(registry), daemonUserId_(daemonUserId) {}
 
+    /// Whether /proc is of this process's own pid namespace: in another's, numbers are other processes'. A daemon for
+    /// which it is not cannot tell its peers apart.
+    [[nodiscard]] static bool procIsOurs();
+
     /// The peer must not outlive this object.
     [[nodiscard]] std::unique_ptr<Peer> peerOfSocket(int socket) override;
     [[nodiscard]] bool ownsRoot(uid_t uid) const override { return uid == 0 || uid == daemonUserId_; }

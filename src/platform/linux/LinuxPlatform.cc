@@ -22,6 +22,10 @@ std::unexpected<std::string> cannot(const std::string& what, int error) {
 } // namespace
 
 std::expected<std::unique_ptr<LinuxPlatform>, std::string> LinuxPlatform::open(Options options) {
+    if (!LinuxPeerIdentity::procIsOurs())
+        return std::unexpected(
+            std::string("/proc is not mounted or belongs to another pid namespace: clients would be "
+                        "taken for other processes. Mount a /proc of this namespace and start again"));
     auto root = SystemRoot::open(options.rootDirectory);
     if (!root)
         return cannot("cannot open the root " + options.rootDirectory, root.error());
