@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // Starting a program in its sandbox, from the start of zorvane-run to the program's end, against bubblewrap alone with
-// the same mounts.
+// the same mounts and namespaces.
 #include "Benchmarks.h"
 
 #include "entitlements/ZOREntitlementMapping.h"
@@ -56,9 +56,9 @@ std::string outputOf(const std::vector<std::string>& command) {
 std::vector<std::string> bareCommand(std::vector<std::string> launcherCommand) {
     launcherCommand.insert(launcherCommand.begin() + 1, {"--dry-run", "--json"});
     const auto plan = nlohmann::json::parse(outputOf(launcherCommand));
-    std::vector<std::string> command = {
-        bubblewrap, "--unshare-pid", "--unshare-ipc", "--unshare-uts", "--new-session", "--die-with-parent",
-        "--proc",   "/proc",         "--dev",         "/dev",          "--tmpfs",       "/tmp"};
+    std::vector<std::string> command = {bubblewrap,      "--unshare-pid", "--unshare-ipc", "--unshare-uts",
+                                        "--unshare-net", "--new-session", "--proc",        "/proc",
+                                        "--dev",         "/dev",          "--tmpfs",       "/tmp"};
     for (const auto& mount : plan.at("mounts")) {
         const std::string path = mount.at("path");
         if (mount.contains("linkTarget"))
@@ -107,7 +107,8 @@ std::vector<Figure> measureRun(const Settings& settings) {
     figure.measured = text("%.2f ms", pairs.measuredMedian());
     figure.floor = text("%.2f ms", pairs.floorMedian());
     figure.value = pairs.ratio();
-    figure.remark = "the floor is bubblewrap with the same mounts; a data and two group containers, /bin/true";
+    figure.remark =
+        "the floor is bubblewrap with the same mounts and namespaces; a data and two group containers, /bin/true";
     figure.numbers = {{"p50ms", pairs.measuredMedian()}, {"floorP50ms", pairs.floorMedian()}};
     return {figure};
 }

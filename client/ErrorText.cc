@@ -77,7 +77,7 @@ constexpr Row rows[] = {
     {27,
      {"the container exists already",
       "a live container has the identifier, or something lies where the new one is to be", "nothing was changed",
-      "remove it first, or replace it"}},
+      "replace it, or look what lies in its place and move that aside"}},
     {28,
      {"the items to delete could not be listed or deleted", diskFailed, "what was not deleted waits for the next pass",
       seeLog}},

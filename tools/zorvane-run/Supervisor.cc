@@ -206,7 +206,8 @@ Result<int> runSandboxed(const Options& options, const std::vector<Mount>& mount
         return *exitCode;
     return std::unexpected(Failure{
         .what = "the sandbox could not be made; " + options.bubblewrap + " or zorvane-run said why above",
-        .advice = "install bubblewrap 0.8 or newer, and allow mount, process and IPC namespaces where this runs"});
+        .advice = "install bubblewrap 0.8 or newer, and allow namespaces where this runs: a unit may not take away "
+                  "CAP_SYS_ADMIN, CAP_NET_ADMIN, CAP_SETUID, CAP_SETGID or CAP_SETPCAP, nor restrict namespaces"});
 }
 
 } // namespace zorvanerun

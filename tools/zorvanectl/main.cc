@@ -207,7 +207,8 @@ void addInstallCommand(CLI::App& app, Arguments& arguments, Action& action) {
     command->add_option("identifier", arguments.target.identifier, "Identifier")->required();
     command
         ->add_option("source", arguments.install.source,
-                     "Archive (tar, zip, cpio, 7-Zip; compressed or not) or directory; at most 2,000,000 items")
+                     "Archive (tar, zip, cpio, 7-Zip; compressed or not) or directory; at most 2,000,000 items. No "
+                     "link of another user leads there")
         ->required();
     addClassAndUser(*command, arguments);
     command->add_flag("-y,--yes", arguments.yes, "Do not ask");
