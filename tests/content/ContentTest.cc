@@ -357,6 +357,13 @@ TEST(Content, OperandsThatOthersHold) {
     link("../his", roots + "/rootsLink", 0);
     link("rootsLoop", roots + "/rootsLoop", 0);
     give(his, ownerId);
+    for (const auto& [folder, mode] : {std::pair("/everybodys", 0777), std::pair("/sticky", 01777)}) {
+        std::filesystem::create_directory(world.path(folder));
+        writeFile(world.path(folder) + "/closed", makeArchive(Form::tar, {file("f")}));
+        ::chmod((world.path(folder) + "/closed").c_str(), 0600);
+        ::chmod(world.path(folder).c_str(), static_cast<mode_t>(mode));
+    }
+    std::filesystem::create_hard_link(roots + "/closed", world.path("/sticky/linked"));
     const std::pair<const char*, const char*> rows[] = {
         {"/roots/closed", ""},
         {"/roots//./../roots/closed", ""},
@@ -374,6 +381,9 @@ TEST(Content, OperandsThatOthersHold) {
         {"/his/way/closed", "way is a symbolic link of user 501"},
         {"/his/way/", "way is a symbolic link of user 501"},
         {"/his/rootsLink", "closed to user 501"}, // root's link, but at a place of his choice
+        {"/everybodys/closed", "where everybody may write"},
+        {"/sticky/closed", ""},
+        {"/sticky/linked", "where everybody may write"},
         {"/his/absent", "No such file"},
     };
     for (const auto& [path, why] : rows) {

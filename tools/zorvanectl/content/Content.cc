@@ -79,7 +79,7 @@ private:
         if (const auto why = holders_.whyRefused(entry.depth, entry.status, item))
             return answer(failed(refusal(name, *why)));
         if (S_ISDIR(entry.status.st_mode))
-            holders_.enter(entry.depth, entry.status.st_uid);
+            holders_.enter(entry.depth, entry.status);
         return answer(course_.addItem());
     }
 

@@ -83,7 +83,7 @@ private:
         if (!next.valid() || ::fstat(next.get(), &directoryStatus_) != 0)
             return cannotOpen(errno);
         directory_ = std::move(next);
-        holders_.addToTheWay(directoryStatus_.st_uid);
+        holders_.addToTheWay(directoryStatus_);
         return {};
     }
 
@@ -112,7 +112,7 @@ private:
         if (const auto why = holders_.whyRefused(1, status, last.get()))
             return refused(*why);
         if (S_ISDIR(status.st_mode))
-            holders_.addToTheWay(status.st_uid);
+            holders_.addToTheWay(status);
         return last;
     }
 
@@ -126,26 +126,35 @@ private:
 
 } // namespace
 
-void Holders::addToTheWay(uid_t owner) {
-    if (!isTrusted(owner) && std::ranges::find(way_, owner) == way_.end())
-        way_.push_back(owner);
+void Holders::addToTheWay(const struct stat& directory) {
+    way_.push_back({.owner = directory.st_uid, .mode = directory.st_mode});
 }
 
-void Holders::enter(std::size_t depth, uid_t owner) {
+void Holders::enter(std::size_t depth, const struct stat& directory) {
     levels_.resize(depth - 1);
-    levels_.push_back(owner);
+    levels_.push_back({.owner = directory.st_uid, .mode = directory.st_mode});
 }
 
 std::optional<std::string> Holders::whyRefused(std::size_t depth, const struct stat& status, int item) const {
-    const auto isAnothers = [&](uid_t holder) { return !isTrusted(holder) && holder != status.st_uid; };
-    const auto levelsEnd = levels_.begin() + static_cast<std::ptrdiff_t>(std::min(depth - 1, levels_.size()));
-    auto holder = std::find_if(way_.begin(), way_.end(), isAnothers);
-    if (holder == way_.end() && (holder = std::find_if(levels_.begin(), levelsEnd, isAnothers)) == levelsEnd)
+    if (item < 0)
         return std::nullopt;
-    if (item < 0 || isReadableForAll(status, item))
-        return std::nullopt;
-    return "it belongs to user " + std::to_string(status.st_uid) + " and lies, closed to user " +
-           std::to_string(*holder) + ", in a directory of that user's, who may have put it there";
+    const std::size_t levels = std::min(depth - 1, levels_.size());
+    for (std::size_t i = 0; i < way_.size() + levels; ++i) {
+        const Holder& holder = i < way_.size() ? way_[i] : levels_[i - way_.size()];
+        const bool isLinked = i + 1 == way_.size() + levels && S_ISREG(status.st_mode) && status.st_nlink > 1;
+        const bool isEverybodys = (holder.mode & S_IWOTH) != 0 && ((holder.mode & S_ISVTX) == 0 || isLinked);
+        const bool isAnothers = !isTrusted(holder.owner) && holder.owner != status.st_uid;
+        if (!isEverybodys && !isAnothers)
+            continue;
+        if (isReadableForAll(status, item))
+            return std::nullopt;
+        const std::string belongs = "it belongs to user " + std::to_string(status.st_uid) + " and lies, closed to ";
+        return isAnothers
+                   ? belongs + "user " + std::to_string(holder.owner) +
+                         ", in a directory of that user's, who may have put it there"
+                   : belongs + "others, in a directory where everybody may write, so anybody may have put it there";
+    }
+    return std::nullopt;
 }
 
 Outcome<FileDescriptor> openForInstallation(const std::string& path, Holders& holders) {

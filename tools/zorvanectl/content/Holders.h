@@ -4,7 +4,8 @@
 // Whoever owns a directory can move into it, or link there, what belongs to others and is closed to him; an
 // installation reads as root and gives what it read away. So each item is judged against all the owners of directories
 // on the way to it: it has to belong to them, or be readable for everybody. Root and whoever runs the program are no
-// such owners. Judged is what was opened, never a name. One thread.
+// such owners. Where everybody may write, anybody may have put it there; into a sticky directory nobody moves what is
+// another's, but a link can be made. Judged is what was opened, never a name. One thread.
 #pragma once
 
 #include "Failure.h"
@@ -21,17 +22,21 @@ namespace zorvanectl::content {
 class Holders {
 public:
     /// A directory on the way to the source, the source itself included.
-    void addToTheWay(uid_t owner);
+    void addToTheWay(const struct stat& directory);
     /// A directory of the source, `depth` levels below its top; those of as many levels or more are left by that.
-    void enter(std::size_t depth, uid_t owner);
+    void enter(std::size_t depth, const struct stat& directory);
 
     /// Why an item of the source, `depth` levels below its top, may not be read; nullopt when it may. `item` is the
     /// open file or directory, or -1 where there is nothing to be read.
     [[nodiscard]] std::optional<std::string> whyRefused(std::size_t depth, const struct stat& status, int item) const;
 
 private:
-    std::vector<uid_t> way_;
-    std::vector<uid_t> levels_; // of the source, from the first below its top
+    struct Holder {
+        uid_t owner = 0;
+        mode_t mode = 0;
+    };
+    std::vector<Holder> way_;
+    std::vector<Holder> levels_; // of the source, from the first below its top
 };
 
 /// Opens a file or directory for reading, and adds the directories on the way. A symbolic link of root's or the
