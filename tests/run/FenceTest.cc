@@ -63,6 +63,7 @@ TEST(Fence, RefusesWhatLeadsOut) {
         {"clone of a process", [] { return endingChild(::syscall(SYS_clone, SIGCHLD, 0, 0, 0, 0)); }, 0},
         {"clone3", [] { return ::syscall(SYS_clone3, nullptr, 0); }, ENOSYS},
         {"setns", [] { return ::syscall(SYS_setns, -1, 0); }, EPERM},
+        {"the kernel's log", [] { return ::syscall(SYS_syslog, 10, nullptr, 0); }, EPERM},
         {"io_uring", [] { return ::syscall(SYS_io_uring_setup, 1, nullptr); }, ENOSYS},
         {"TIOCSTI", [] { return ::syscall(SYS_ioctl, -1, TIOCSTI, "x"); }, EPERM},
         {"TIOCSTI, high half", [] { return ::syscall(SYS_ioctl, -1, TIOCSTI | 1UL << 40, "x"); }, EPERM},

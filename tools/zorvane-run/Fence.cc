@@ -33,7 +33,7 @@ bool leaveKeys() {
 
 bool fence(Network network) {
     zor::platform::SystemCallFilter filter;
-    for (const int call : {SYS_add_key, SYS_request_key, SYS_keyctl, SYS_setns})
+    for (const int call : {SYS_add_key, SYS_request_key, SYS_keyctl, SYS_setns, SYS_syslog})
         filter.refuse(call, EPERM);
     filter.refuseBits(SYS_unshare, unshareFlags, CLONE_NEWUSER, EPERM);
     filter.refuseBits(SYS_clone, cloneFlags, CLONE_NEWUSER, EPERM);

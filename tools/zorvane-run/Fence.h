@@ -3,8 +3,9 @@
 // namespaces do not hold apart.
 //
 // Those are: keys (the caller's, and those that all processes of one user share); namespaces of the program's own, in
-// which it would have every capability; typing into the caller's terminal; and, without the host's network, sockets of
-// families that no network namespace holds apart. io_uring is refused with them, for its calls pass by the filter.
+// which it would have every capability; the kernel's log; typing into the caller's terminal; and, without the host's
+// network, sockets of families that no network namespace holds apart. io_uring is refused with them, for its calls pass
+// by the filter.
 #pragma once
 
 #include "Options.h"
