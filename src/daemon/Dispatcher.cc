@@ -115,10 +115,12 @@ Dispatcher::checkEntitlementsAndInitClientObject(const ZORCommandTableRow& row, 
     }
     ZORClientConnection::Client client{.userId = identity.effectiveUserId,
                                        .allowOtherIdLookup = otherIdLookup,
-                                       .entitledWipeIdentifiers = std::move(wipeIdentifiers)};
+                                       .entitledWipeIdentifiers = std::move(wipeIdentifiers),
+                                       .onlyOwnIdentifier = identity.grant->onlyOwnIdentifier};
     if (identifier)
         client.bundleIdentifier = *identifier;
-    registerEntitlements(identifier, *entitlements);
+    const auto& together = identity.grant->identifierEntitlements;
+    registerEntitlements(identifier, together ? *together : *entitlements);
     return std::make_shared<ZORClientConnection>(services_, std::move(client));
 }
 

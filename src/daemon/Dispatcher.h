@@ -40,6 +40,7 @@ private:
     std::shared_ptr<ZORClientConnection> checkEntitlementsAndInitClientObject(const ZORCommandTableRow& row,
                                                                               const platform::Identity& identity);
     /// Keeps what is stored for the peer's identifier up to date, unless somebody registered it on the peer's behalf.
+    /// `entitlements` are the identifier's, whichever of its executables the message comes from.
     void registerEntitlements(const std::string* identifier, const plist::Dictionary& entitlements) const;
     void sayMissingEntitlement(const ZORCommandTableRow& row, const platform::Identity& identity) const;
 

@@ -23,6 +23,7 @@ plist::Dictionary describe(const platform::Identity& identity) {
     if (identity.grant->identifier)
         peer.set("Identifier", *identity.grant->identifier);
     peer.set("KernelAgent", identity.grant->kernelAgent);
+    peer.set("OnlyOwnIdentifier", identity.grant->onlyOwnIdentifier);
     if (const auto& entitlements = identity.grant->entitlements) {
         peer.set("MaySendEveryCommand", entitlements->isTrue(powers::allowed));
         peer.set("MayLookUpOtherIdentifiers",

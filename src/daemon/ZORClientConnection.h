@@ -54,6 +54,8 @@ public:
         std::uint32_t userId = 0;
         bool allowOtherIdLookup = false;
         std::optional<std::vector<std::string>> entitledWipeIdentifiers;
+        /// The client may ask for its own identifier only, whatever its powers are.
+        bool onlyOwnIdentifier = false;
     };
     ZORClientConnection(StoreServices& services, Client client)
         : services_(services), client_(std::move(client)), allowOtherIdLookup_(client_.allowOtherIdLookup) {}
@@ -62,6 +64,7 @@ public:
 
     [[nodiscard]] const std::optional<std::string>& clientBundleIdentifier() const { return client_.bundleIdentifier; }
     [[nodiscard]] std::uint32_t clientUserId() const { return client_.userId; }
+    [[nodiscard]] bool onlyOwnIdentifier() const { return client_.onlyOwnIdentifier; }
     // What the client may look up beyond its own; handlers widen or narrow it. Any thread: the daemon's own client is
     // used by several.
     [[nodiscard]] bool allowOtherIdLookup() const { return allowOtherIdLookup_; }

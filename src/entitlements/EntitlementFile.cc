@@ -3,20 +3,50 @@
 
 #include "fs/DictionaryFile.h"
 
+#include <algorithm>
+
 namespace zor {
 
 namespace {
 
-/// The groups that an entry of the map lists for this type, whatever they are; nullptr for none.
-const plist::Value* groupsIn(const plist::Value& entry, GroupType type) {
+/// Whether nothing at all is handed out of this value, so that the one under the other key counts as well.
+bool givesNothing(const plist::Value* value) {
+    if (!value || value->asString())
+        return !value;
+    const plist::Array* array = value->asArray();
+    return !array || array->empty() ||
+           !std::ranges::all_of(*array, [](const plist::Value& element) { return element.asString(); });
+}
+
+/// What an entry of the map lists for this type, whatever it is. Who is handed a group counts, and so does who lists it
+/// in a list that is not handed out.
+std::vector<const plist::Value*> groupsIn(const plist::Value& entry, GroupType type) {
+    std::vector<const plist::Value*> lists;
+    const auto add = [&](const plist::Value* value) {
+        if (value)
+            lists.push_back(value);
+        return givesNothing(value);
+    };
     const plist::Dictionary* entitlements = entry.asDictionary();
     if (!entitlements)
-        return nullptr;
+        return lists;
     if (type == GroupType::application)
-        return entitlements->find(entitlementKeys::applicationGroups);
-    const plist::Value* value = entitlements->find(entitlementKeys::systemGroups);
-    const bool nothing = !value || (value->asArray() && value->asArray()->empty());
-    return nothing ? entitlements->find(entitlementKeys::systemGroupContainers) : value;
+        add(entitlements->find(entitlementKeys::applicationGroups));
+    else if (add(entitlements->find(entitlementKeys::systemGroups)))
+        add(entitlements->find(entitlementKeys::systemGroupContainers));
+    return lists;
+}
+
+/// The groups in a list, or the one that stands in its place.
+std::vector<std::string> groupNamesIn(const plist::Value& list) {
+    if (const std::string* one = list.asString())
+        return {*one};
+    std::vector<std::string> names;
+    if (const plist::Array* array = list.asArray())
+        for (const plist::Value& element : *array)
+            if (const std::string* name = element.asString())
+                names.push_back(*name);
+    return names;
 }
 
 } // namespace
@@ -34,19 +64,16 @@ GroupReferences groupReferencesIn(const plist::Dictionary& map, GroupType type, 
     constexpr const char* function = "_copyReferenceCountSetOfType";
     GroupReferences references;
     for (const auto& [identifier, entry] : map) {
-        const plist::Value* groups = groupsIn(entry, type);
-        if (!groups)
-            continue;
-        const plist::Array* array = groups->asArray();
-        if (log && !array)
-            log->write(logLevelError, function, "identifier: %s has non-array type of group container IDs: %s",
-                       ZOR_SHOWN(identifier), plist::describe(groups).c_str());
-        else if (log && log->writes(logLevelDebug))
-            log->write(logLevelDebug, function, "Entitlements for identifier %s references container IDs: %s",
-                       ZOR_SHOWN(identifier), plist::describe(groups).c_str());
-        for (const plist::Value& group : array ? *array : plist::Array())
-            if (const std::string* name = group.asString())
-                references[*name].push_back(identifier);
+        for (const plist::Value* groups : groupsIn(entry, type)) {
+            if (log && !groups->asArray())
+                log->write(logLevelError, function, "identifier: %s has non-array type of group container IDs: %s",
+                           ZOR_SHOWN(identifier), plist::describe(groups).c_str());
+            else if (log && log->writes(logLevelDebug))
+                log->write(logLevelDebug, function, "Entitlements for identifier %s references container IDs: %s",
+                           ZOR_SHOWN(identifier), plist::describe(groups).c_str());
+            for (std::string& name : groupNamesIn(*groups))
+                references[std::move(name)].push_back(identifier);
+        }
     }
     return references;
 }

@@ -7,6 +7,7 @@
 #include "daemon/base/UserIdentity.h"
 #include "entitlements/ZOREntitlementMapping.h"
 #include "migration/ZORContainerMigrator.h"
+#include "plist/Unite.h"
 #include "store/Names.h"
 
 #include <array>
@@ -75,10 +76,16 @@ bool ZOREntitlementMapping::groupIdsAreMigrated() {
 bool ZOREntitlementMapping::migrateGroupIdentifiers(const ZORMetadata& container) {
     const std::string& identifier = container.identifier();
     const plist::Value groups = *groupIdentifiersIn(container);
+    const plist::Dictionary migrated{{std::string(entitlementKeys::applicationGroups), groups}};
     ZOR_LOG(log_, logLevelDebug, "Data container for userId: %u, identifier %s references container IDs: %s",
             firstMobileUserId, ZOR_SHOWN(identifier), plist::describe(&groups).c_str());
-    const auto stored = _setEntitlementDictionaryValues(
-        {plist::Dictionary{{std::string(entitlementKeys::applicationGroups), groups}}}, {identifier});
+    // Whoever registered meanwhile did so under this system: what it said stays, and the older list is added.
+    const auto stored = [&] {
+        const platform::MutexLock held(entitlementQueue_);
+        const plist::Dictionary* const entry = entitlementsOf(identifier);
+        return _onQueue_setEntitlementDictionaryValues({entry ? plist::united(*entry, migrated) : migrated},
+                                                       {identifier});
+    }();
     if (!stored) {
         log_.write(logLevelError, migrateFunction, "Failed to write group id entitlements for %s to file : %s",
                    ZOR_SHOWN(identifier), stored.error().text().c_str());

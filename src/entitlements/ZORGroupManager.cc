@@ -78,8 +78,7 @@ void ZORGroupManager::_removeGroupContainersIfNeededforUser(std::uint32_t userId
                                                             const References& references) {
     const auto holders = references.find(group);
     const std::size_t count = holders == references.end() ? 0 : holders->second.size();
-    // A list that is malformed gives its identifier groups that are not counted for it: the one reference to such a
-    // group is somebody else's.
+    // One reference that is somebody else's is not the one that goes.
     if (count != 1 || holders->second.front() != identifier) {
         ZOR_LOG(log_, logLevelDebug, "Reference count for user: %u, ID: %s is %ld", userId, ZOR_SHOWN(group),
                 static_cast<long>(count));

@@ -18,6 +18,11 @@ struct IdentityGrant {
     std::optional<std::string> identifier;
     std::optional<plist::Dictionary> entitlements;
     bool kernelAgent = false;
+    /// The peer may ask for its own identifier only.
+    bool onlyOwnIdentifier = false;
+    /// What all entries of the identifier entitle it to together; absent where this is its only entry. Stored for the
+    /// identifier, and no power.
+    std::optional<plist::Dictionary> identifierEntitlements;
 };
 
 /// The answer for one message.

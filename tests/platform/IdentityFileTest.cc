@@ -42,6 +42,7 @@ TEST(IdentityFile, RefusesWhatItDoesNotUnderstand) {
         file(executable + "<key>SecurityLabel</key><true/>"),
         file(executable + "<key>Entitlements</key><array/>"),
         file(executable + "<key>KernelAgent</key><integer>1</integer>"),
+        file(executable + "<key>OnlyOwnIdentifier</key><string>true</string>"),
         // A fence with a typing mistake must not be a fence that is not there.
         file(executable + "<key>UserIds</key><array><integer>501</integer></array>"),
         file(executable + "<key>Executable </key><string>/b</string>"),

@@ -91,6 +91,33 @@ TEST(PeerIdentity, TakesTheFirstEntryThatMatches) {
     }
 }
 
+// Entries of one identifier keep their own powers, and each tells what they grant together, also when another changes.
+TEST(IdentityRegistry, UnitesTheEntriesOfAnIdentifier) {
+    PeerWorld world;
+    const auto entitled = [](const std::string& body) { return "<key>Entitlements</key><dict>" + body + "</dict>"; };
+    const auto groups = [](const std::string& name) {
+        return "<key>groups</key><array><string>" + name + "</string><string>both</string></array>";
+    };
+    world.registerAs("a.plist", "sleeper", "app", entitled(groups("a") + "<key>power</key><true/>"));
+    world.registerAs("b.plist", "agent", "app", entitled(groups("b") + "<key>one</key><string>x</string>"));
+    const PeerProcess process(world.server, world.program("agent"));
+    const auto peer = world.peerOf(process);
+    const auto together = [&] { return peer->identify(Peer::Explain::no).grant->identifierEntitlements; };
+    EXPECT_EQ(together(),
+              (plist::Dictionary{{"groups", plist::Array{"a", "both", "b"}}, {"one", "x"}, {"power", true}}));
+    EXPECT_FALSE(peer->identify(Peer::Explain::no).grant->entitlements->isTrue("power"));
+    world.registerAs("a.plist", "sleeper", "app", entitled("<key>groups</key><string>c</string>"));
+    world.registry.takeNotices();
+    EXPECT_EQ(together(), (plist::Dictionary{{"groups", plist::Array{"c", "b", "both"}}, {"one", "x"}}));
+    const auto grant = peer->identify(Peer::Explain::no).grant;
+    world.registerAs("c.plist", "other", "unrelated");
+    world.registry.takeNotices();
+    EXPECT_EQ(peer->identify(Peer::Explain::no).grant, grant);
+    world.registerAs("a.plist", "sleeper", "else");
+    world.registry.takeNotices();
+    EXPECT_EQ(together(), std::nullopt);
+}
+
 // What could have been put there by others, or could hold up the reader, is ignored and said once.
 TEST(IdentityRegistry, IgnoresWhatMayBeForged) {
     PeerWorld world;

@@ -87,6 +87,37 @@ TEST_F(Shared, GroupPaths) {
     EXPECT_FALSE(isThere(*appPaths.dictionary("ReplyGroupContainerDict")->string("g")));
 }
 
+// Goal: who is fenced in reaches its own identifier and no other, whatever its powers. Method: a table of requests.
+TEST_F(Shared, OnlyItsOwnIdentifier) {
+    (void)codeOf({{"Command", 18}, {"Identifier", "other"}, {"Entitlements", Dictionary{{appGroups, Array{"g"}}}}});
+    const auto fenced = [&](const std::optional<std::string>& identifier) {
+        auto granted = std::make_shared<platform::IdentityGrant>(*grant(identifier, everything));
+        granted->onlyOwnIdentifier = true;
+        as(granted);
+    };
+    struct Row {
+        std::uint64_t command;
+        std::optional<std::string> client;
+        const char* identifier;
+        std::uint64_t code;
+    };
+    const Row rows[] = {{0, "app", nullptr, 1},   {0, "app", "app", 1},     {0, "app", "other", 55},
+                        {0, {}, "other", 55},     {0, {}, nullptr, 11},     {13, "app", nullptr, 1},
+                        {13, "app", "app", 1},    {13, "app", "other", 55}, {14, "app", nullptr, 1},
+                        {14, "app", "other", 55}, {16, "app", "app", 1},    {16, "app", "other", 55}};
+    for (const auto& [command, client, identifier, code] : rows) {
+        SCOPED_TRACE(std::to_string(command) + " for " + (identifier ? identifier : "(none)"));
+        fenced(client);
+        Dictionary message{{"Command", command}, {"UserID", 1}, {"ContainerClass", 2}, {"CreateIfNecessary", true}};
+        if (identifier)
+            message.set("Identifier", identifier);
+        const Dictionary reply = request(message);
+        EXPECT_EQ(errorOf(reply), code);
+        EXPECT_EQ(reply.size() == 1, code != 1);
+    }
+    EXPECT_FALSE(world.find("other"));
+}
+
 // Goal: whose system container and which system group a client reaches. Method: a table of clients and requests.
 TEST_F(Shared, SystemContainersAndGroups) {
     const Dictionary owner{{systemContainer, true}};

@@ -89,6 +89,7 @@ TEST_F(Processing, WhatAChangeReleases) {
     const Dictionary s{{groups, Array{"systemgroup.s"}}};
     const Dictionary byOtherKey{{groupContainers, Array{"systemgroup.s"}}};
     const Dictionary firstEmpty{{groups, Array{}}, {groupContainers, Array{"systemgroup.s"}}};
+    const Dictionary firstNoList{{groups, 5}, {groupContainers, Array{"systemgroup.s"}}};
     const Dictionary hidden{{groups, Array{"systemgroup.t"}}, {groupContainers, Array{"systemgroup.s"}}};
     const Dictionary unprefixed{{groups, Array{"unprefixed"}}};
     const Dictionary container{{systemContainer, true}};
@@ -99,10 +100,10 @@ TEST_F(Processing, WhatAChangeReleases) {
         {"everything, as an empty dictionary", both, none, Dictionary{}, {"g", "h"}},
         {"another holds it", both, g, none, {"h"}},
         {"another holds it among things that are none", both, mixed, none, {"h"}},
-        {"another's string does not count", both, text, none, {"g", "h"}},
+        {"another holds it as a string", both, text, none, {"h"}},
         {"listed twice", twice, none, none, {}},
-        {"its own string does not count", text, none, none, {}},
-        {"the one counted is another's", text, g, none, {}},
+        {"its own string", text, none, none, {"g"}},
+        {"its own string, another's list", text, g, none, {}},
         {"from a list to a string", g, none, text, {}},
         {"what is no list means none", g, none, mixed, {"g"}},
         {"only another key", more, none, g, {}},
@@ -111,6 +112,7 @@ TEST_F(Processing, WhatAChangeReleases) {
         {"a system group", s, none, unrelated, {"systemgroup.s"}},
         {"by the other key", byOtherKey, none, none, {"systemgroup.s"}},
         {"the first key is empty", firstEmpty, none, none, {"systemgroup.s"}},
+        {"the first key is no list", firstNoList, none, none, {"systemgroup.s"}},
         {"from key to key", s, none, byOtherKey, {}},
         {"another holds it by the other key", s, byOtherKey, none, {}},
         {"the other key is hidden", hidden, none, none, {}},

@@ -11,10 +11,11 @@ namespace keys = ipc::keys;
 void createOrLookupContainer(CommandContext& context) {
     const ContainerClass containerClass = classOf(context.request, keys::containerClass);
     const auto user = userOf(context, keys::userId, containerClass);
-    if (!user)
+    const std::string* identifier = ownIdentifierByDefault(context);
+    if (!user || !mayAskFor(context, identifier))
         return;
     const auto found = context.client->createOrLookupContainerForUser(
-        *user, ownIdentifierByDefault(context), containerClass,
+        *user, identifier, containerClass,
         {.createIfNecessary = context.request.isTrue(keys::createIfNecessary),
          .transient = context.request.isTrue(keys::transient)});
     if (!found) {

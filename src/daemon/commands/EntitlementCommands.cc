@@ -16,8 +16,10 @@ namespace keys = ipc::keys;
 namespace {
 
 void replyWithGroupPaths(CommandContext& context, std::uint32_t userId) {
-    const auto paths =
-        context.services.groups.groupContainerPathsForUser(userId, *context.client, ownIdentifierByDefault(context));
+    const std::string* identifier = ownIdentifierByDefault(context);
+    if (!mayAskFor(context, identifier))
+        return;
+    const auto paths = context.services.groups.groupContainerPathsForUser(userId, *context.client, identifier);
     if (!paths) {
         context.error = paths.error().replyCode();
         return;
@@ -72,10 +74,10 @@ void getGroupContainerPaths(CommandContext& context) {
 
 void getGroupContainerIdentifiers(CommandContext& context) {
     const auto user = userOf(context, keys::userId, ContainerClass::sharedAppGroup);
-    if (!user)
+    const std::string* identifier = ownIdentifierByDefault(context);
+    if (!user || !mayAskFor(context, identifier))
         return;
-    const auto groups =
-        context.services.groups.groupContainerIdentifiersForUser(*user, ownIdentifierByDefault(context));
+    const auto groups = context.services.groups.groupContainerIdentifiersForUser(*user, identifier);
     if (!groups) {
         context.error = groups.error().replyCode();
         return;

@@ -23,6 +23,18 @@ namespace zor::commands {
     return own ? &*own : nullptr;
 }
 
+/// The same for who may be fenced in to its own identifier. False, logged, for another one: the context has its error.
+[[nodiscard]] inline bool mayAskFor(CommandContext& context, const std::string* identifier) {
+    const auto& own = context.client->clientBundleIdentifier();
+    if (!context.client->onlyOwnIdentifier() || !identifier || (own && *identifier == *own))
+        return true;
+    makeError(context.log, ZOR_HERE, ErrorCode::notEntitled, nullptr, LogFlag::yes,
+              "%s may ask for its own identifier only, not for %s (\"OnlyOwnIdentifier\" in its registry entry)",
+              ZOR_SHOWN(own), ZOR_SHOWN(*identifier));
+    context.error = ErrorCode::notEntitled;
+    return false;
+}
+
 /// The user that stands for `requested` (its low 32 bits count). Without one the context has its error.
 [[nodiscard]] inline std::optional<std::uint32_t> validatedUser(CommandContext& context, std::uint64_t requested,
                                                                 ContainerClass containerClass) {

@@ -19,8 +19,9 @@ constexpr std::string_view keyUnit = "Unit";
 constexpr std::string_view keySecurityLabel = "SecurityLabel";
 constexpr std::string_view keyEntitlements = "Entitlements";
 constexpr std::string_view keyKernelAgent = "KernelAgent";
-constexpr std::array keysKnown = {keyIdentifier,    keyExecutable,   keyUserIds,    keyUnit,
-                                  keySecurityLabel, keyEntitlements, keyKernelAgent};
+constexpr std::string_view keyOnlyOwnIdentifier = "OnlyOwnIdentifier";
+constexpr std::array keysKnown = {keyIdentifier,    keyExecutable,   keyUserIds,     keyUnit,
+                                  keySecurityLabel, keyEntitlements, keyKernelAgent, keyOnlyOwnIdentifier};
 
 using Problem = std::optional<std::string>;
 
@@ -36,6 +37,17 @@ Problem readString(const plist::Dictionary& file, std::string_view key, std::opt
     if (!text || text->empty() || text->find('\0') != std::string::npos)
         return wrong(key, "no string, or an empty one");
     out = *text;
+    return {};
+}
+
+Problem readFlag(const plist::Dictionary& file, std::string_view key, bool& out) {
+    const plist::Value* const value = file.find(key);
+    if (!value)
+        return {};
+    const bool* const flag = value->asBoolean();
+    if (!flag)
+        return wrong(key, "no boolean");
+    out = *flag;
     return {};
 }
 
@@ -67,12 +79,10 @@ Problem readGrant(const plist::Dictionary& file, RegistryEntry& entry) {
             return wrong(keyEntitlements, "no dictionary");
         grant->entitlements = *entitlements;
     }
-    if (const plist::Value* const value = file.find(keyKernelAgent)) {
-        const bool* const flag = value->asBoolean();
-        if (!flag)
-            return wrong(keyKernelAgent, "no boolean");
-        grant->kernelAgent = *flag;
-    }
+    if (Problem problem = readFlag(file, keyKernelAgent, grant->kernelAgent))
+        return problem;
+    if (Problem problem = readFlag(file, keyOnlyOwnIdentifier, grant->onlyOwnIdentifier))
+        return problem;
     entry.grant = std::move(grant);
     return {};
 }
@@ -117,7 +127,8 @@ bool RegistryEntry::admitsUser(std::uint32_t reportedUserId) const {
 bool RegistryEntry::operator==(const RegistryEntry& other) const {
     return executable == other.executable && userIds == other.userIds && unit == other.unit &&
            securityLabel == other.securityLabel && grant->identifier == other.grant->identifier &&
-           grant->entitlements == other.grant->entitlements && grant->kernelAgent == other.grant->kernelAgent;
+           grant->entitlements == other.grant->entitlements && grant->kernelAgent == other.grant->kernelAgent &&
+           grant->onlyOwnIdentifier == other.grant->onlyOwnIdentifier;
 }
 
 std::expected<RegistryEntry, std::string> parseIdentityFile(std::span<const std::uint8_t> bytes) {

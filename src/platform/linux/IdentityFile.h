@@ -28,7 +28,7 @@ struct RegistryEntry {
 
     /// The uid as reported: 0 is the owner of the root.
     [[nodiscard]] bool admitsUser(std::uint32_t reportedUserId) const;
-    /// Compares what is granted, not where it lies in memory.
+    /// Compares what the files say, not where it lies in memory, nor what other files add to it.
     bool operator==(const RegistryEntry& other) const;
 };
 

@@ -3,10 +3,12 @@
 
 #include "platform/Format.h"
 #include "platform/linux/Names.h"
+#include "plist/Unite.h"
 
 #include <algorithm>
 #include <ctime>
 #include <fcntl.h>
+#include <map>
 
 namespace zor::platform {
 
@@ -117,6 +119,7 @@ void IdentityRegistry::look(Read read) {
         registered.executable = executableAt(registered.entry->executable);
     }
     watches_.end();
+    uniteIdentifiers(entries);
     listing_ = std::move(listing);
     publish(std::move(entries));
     hasLooked_ = true;
@@ -158,6 +161,31 @@ std::vector<IdentityRegistry::Registered> IdentityRegistry::readEntries(const Re
         entries.push_back({.fileName = name, .entry = std::move(entry), .executable = {}});
     }
     return entries;
+}
+
+void IdentityRegistry::uniteIdentifiers(std::vector<Registered>& entries) {
+    std::map<std::string, std::vector<Registered*>, std::less<>> holders;
+    for (Registered& registered : entries)
+        if (const auto& identifier = registered.entry->grant->identifier)
+            holders[*identifier].push_back(&registered);
+    for (const auto& [identifier, all] : holders) {
+        std::optional<plist::Dictionary> together;
+        if (all.size() > 1) {
+            together.emplace();
+            for (const Registered* registered : all)
+                if (const auto& entitlements = registered->entry->grant->entitlements)
+                    together = plist::united(std::move(*together), *entitlements);
+        }
+        for (Registered* registered : all) {
+            if (registered->entry->grant->identifierEntitlements == together)
+                continue;
+            auto grant = std::make_shared<IdentityGrant>(*registered->entry->grant);
+            grant->identifierEntitlements = together;
+            auto entry = std::make_shared<RegistryEntry>(*registered->entry);
+            entry->grant = std::move(grant);
+            registered->entry = std::move(entry);
+        }
+    }
 }
 
 void IdentityRegistry::publish(std::vector<Registered> entries) {

@@ -80,6 +80,8 @@ private:
     [[nodiscard]] bool looksUnchanged(const Snapshot& old) const ZOR_REQUIRES(reading_);
     [[nodiscard]] std::vector<Registered> readEntries(const RegistryListing& listing, Read read,
                                                       std::vector<RegistryProblem>& problems) ZOR_REQUIRES(reading_);
+    /// Tells each entry what all entries of its identifier grant together. One that knows it keeps its objects.
+    static void uniteIdentifiers(std::vector<Registered>& entries);
     void publish(std::vector<Registered> entries) ZOR_REQUIRES(reading_);
     void sayProblems(std::vector<RegistryProblem> problems) ZOR_REQUIRES(reading_);
 

@@ -1,0 +1,170 @@
+// SPDX-License-Identifier: Apache-2.0
+// Conditions that a boot may meet, and what they may not cost: each row is a device, one boot or more over it, and a
+// look at what has to be there afterwards.
+#include "entitlements/ZOREntitlementMapping.h"
+#include "platform/ServiceListener.h"
+#include "world/World.h"
+
+#include <filesystem>
+#include <functional>
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+namespace zor::test {
+namespace {
+
+using plist::Array;
+using plist::Dictionary;
+using support::DiskCall;
+
+const std::string uuids[] = {"11111111-0000-4000-8000-000000000000", "22222222-0000-4000-8000-000000000000"};
+const std::string appGroups(entitlementKeys::applicationGroups);
+const std::string groupsOfSecond = "private/var/second/Containers/Shared/AppGroup";
+const std::string formerBundle = std::string(mobileContainers) + "/Bundle/Application/" + uuids[0];
+const std::string bundleMarker = std::string(libraryPath) + "/zor_bundle_migration_complete.plist";
+
+void boot(World& world) {
+    world.restart();
+    world.boot();
+}
+
+/// A group's container of the second user.
+void putGroup(World& world, const std::string& group, const std::string& uuid) {
+    world.putContainer(groupsOfSecond + "/" + uuid, metadataOf(7, second, group, uuid));
+}
+
+/// A data container of mobile's that names its groups itself, as an older system left it.
+void putWithGroup(World& world, const std::string& identifier, const std::string& group) {
+    Dictionary metadata = metadataOf(2, mobile, identifier, uuids[0]);
+    metadata.set("ZORMetadataInfo", Dictionary{{"com.veltra.Brevance.GroupContainerIDs", Array{group}}});
+    world.putContainer(applications + "/" + uuids[0], metadata);
+}
+
+void store(World& world, const std::string& identifier, const Dictionary& entitlements) {
+    ASSERT_EQ(world.services().entitlements().processEntitlements(&entitlements, &identifier, nullptr),
+              ErrorCode::success);
+}
+
+/// A connection of this very process to the dispatcher, judged by the registry below the root.
+class OwnConnection final : public platform::PeerConnection {
+public:
+    explicit OwnConnection(World& world) {
+        EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, sockets_), 0);
+        peer_ = world.linux().roles().peers.peerOfSocket(sockets_[0]);
+    }
+    ~OwnConnection() override {
+        ::close(sockets_[0]);
+        ::close(sockets_[1]);
+    }
+    platform::Peer& peer() override { return *peer_; }
+    void cancel() override { ADD_FAILURE() << peer_->identify(platform::Peer::Explain::yes).explanation; }
+
+private:
+    int sockets_[2] = {};
+    std::unique_ptr<platform::Peer> peer_;
+};
+
+class NoReply final : public platform::ReplyChannel {
+public:
+    void send(const Dictionary&) override {}
+};
+
+void registerProgram(World& world, const std::string& file, const std::string& program, const std::string& group) {
+    world.write("etc/zorvane/identities.d/" + file,
+                binary(Dictionary{{"Identifier", "app"},
+                                  {"Executable", program},
+                                  {"Entitlements", Dictionary{{appGroups, Array{group}}}}}));
+}
+
+struct Condition {
+    const char* name;
+    std::function<void(World&)> meet;
+    /// Containers that have to be where they are, relative to the root.
+    std::vector<std::string> stays;
+    std::function<void(World&)> judge;
+};
+
+// Goal: nothing that a boot meets costs what somebody refers to, and what it could not do a later boot does.
+// Method: a table of conditions, each met over a real root.
+TEST(BootConditions, CostNothing) {
+    const Condition conditions[] = {
+        {"a group given as one string",
+         [](World& world) {
+             store(world, "app", {{appGroups, "group.text"}});
+             putGroup(world, "group.text", uuids[0]);
+             boot(world);
+         },
+         {groupsOfSecond + "/" + uuids[0]},
+         [](World& world) {
+             EXPECT_EQ(world.services().entitlements().appGroupIdentifiersForIdentifier("app"),
+                       ZOREntitlementMapping::Identifiers({"group.text"}));
+         }},
+        {"a registration before the group migration",
+         [](World& world) {
+             store(world, "app", {{appGroups, Array{"group.new"}}, {"kept", true}});
+             putWithGroup(world, "app", "group.old");
+             putGroup(world, "group.old", uuids[0]);
+             putGroup(world, "group.new", uuids[1]);
+             boot(world);
+         },
+         {groupsOfSecond + "/" + uuids[0], groupsOfSecond + "/" + uuids[1]},
+         [](World& world) {
+             EXPECT_EQ(*world.services().entitlements().entitlementMappingDict().dictionary("app"),
+                       (Dictionary{{appGroups, Array{"group.new", "group.old"}}, {"kept", true}}));
+         }},
+        {"a bundle's record that cannot be written once",
+         [](World& world) {
+             world.putContainer(formerBundle, metadataOf(1, mobile, "bundle", uuids[0]));
+             world.restart();
+             world.load();
+             world.disk().arm({.error = EIO, .filter = [](const auto& call) {
+                                   return call.call == DiskCall::createFile &&
+                                          call.subject.find("metadata") != std::string::npos;
+                               }});
+             world.boot();
+             world.disk().disarm();
+             EXPECT_FALSE(world.exists(bundleMarker));
+             EXPECT_FALSE(world.find("bundle", ContainerClass::bundleApplication));
+             boot(world);
+         },
+         {bundleMarker},
+         [](World& world) { EXPECT_TRUE(world.find("bundle", ContainerClass::bundleApplication)); }},
+        {"two entries of one identifier",
+         [](World& world) {
+             registerProgram(world, "a.plist", std::filesystem::read_symlink("/proc/self/exe"), "group.a");
+             registerProgram(world, "b.plist", "/bin/true", "group.b");
+             store(world, "app", {});
+             putGroup(world, "group.a", uuids[0]);
+             putGroup(world, "group.b", uuids[1]);
+             // As the other program left it.
+             const Dictionary byCaller{{std::string(entitlementMapKeys::registeredByCaller), true}};
+             const Dictionary others{{appGroups, Array{"group.a", "group.b"}}};
+             ASSERT_EQ(world.services().entitlements().processEntitlements(
+                           &others, std::make_unique<std::string>("app").get(), &byCaller),
+                       ErrorCode::success);
+             boot(world);
+             OwnConnection connection(world);
+             platform::ServiceEvent event{.kind = platform::ServiceEvent::Kind::message,
+                                          .request = {{"Command", 13}, {"UserID", second}},
+                                          .reply = std::make_shared<NoReply>()};
+             world.services().dispatcher().ZORProcessIpsiEvent(connection, event);
+         },
+         {groupsOfSecond + "/" + uuids[0], groupsOfSecond + "/" + uuids[1]},
+         [](World& world) {
+             EXPECT_EQ(world.services().entitlements().appGroupIdentifiersForIdentifier("app"),
+                       ZOREntitlementMapping::Identifiers({"group.a", "group.b"}));
+         }},
+    };
+    for (const Condition& condition : conditions) {
+        SCOPED_TRACE(condition.name);
+        World world;
+        condition.meet(world);
+        for (const std::string& path : condition.stays)
+            EXPECT_TRUE(world.exists(path)) << path;
+        condition.judge(world);
+    }
+}
+
+} // namespace
+} // namespace zor::test
