@@ -38,6 +38,13 @@ bool isMisshapen(const ZORError& error) {
     return error.isPosix(ELOOP) || error.isPosix(ENOTDIR);
 }
 
+/// Of a container: whether it was not looked at, or not written, rather than judged not to be a bundle's.
+bool isUnfinished(const ZORError& error) {
+    const ZORError* const cause = error.underlying();
+    return error.is(ErrorCode::propertyListNotWritten) ||
+           (cause && (cause->isOwnShortage() || cause->isPosix(EIO) || cause->isPosix(ENOKEY)));
+}
+
 long long code(const ZORError& error) {
     return error.code();
 }
@@ -103,6 +110,14 @@ ZORContainerMigrator::Outcome ZORContainerMigrator::performMigrationWithError() 
                                    LogFlag::yes, "Failed to change owner of %s: %s", bundles.c_str(),
                                    owned.error().text().c_str()),
                 .migrated = count.migrated};
+    if (count.unfinished != 0) {
+        log.write(
+            logLevelError, migrationFunction,
+            "Not writing the marker file: %llu bundle containers or their places could not be read or written; the "
+            "next boot tries again",
+            static_cast<unsigned long long>(count.unfinished));
+        return {.succeeded = true, .error = std::move(count.last), .migrated = count.migrated};
+    }
     log.write(logLevelNotice, migrationFunction, "Successful bundle migration. Writing marker file.");
     writeMigrationFileToDiskWithName(names::bundleMigrationMarker);
     return {.succeeded = true, .error = std::move(count.last), .migrated = count.migrated};
@@ -163,9 +178,11 @@ void ZORContainerMigrator::adoptBundlesOfClass(ContainerClass containerClass, Co
         services_.configuration.sharedContainersDirectory().appendingDirectory(className(containerClass));
     const auto containers = services_.fileManager.urlsForItemsInDirectoryAtURL(directory);
     if (!containers) {
-        if (!containers.error().isPosix(ENOENT))
+        if (!containers.error().isPosix(ENOENT)) {
             services_.log.write(logLevelError, migrationFunction, "Failed to get items at staging URL%s : %s",
                                 directory.c_str(), containers.error().text().c_str());
+            count.unfinished += isMisshapen(containers.error()) ? 0 : 1;
+        }
         // The user who owned the old place may have put anything there; a link in a class directory's place would keep
         // the class from ever having one.
         if (isMisshapen(containers.error()))
@@ -177,6 +194,7 @@ void ZORContainerMigrator::adoptBundlesOfClass(ContainerClass containerClass, Co
             ++count.migrated;
         } else {
             ++count.errors;
+            count.unfinished += isUnfinished(adopted.error()) ? 1 : 0;
             count.last = std::move(adopted).error();
         }
     }

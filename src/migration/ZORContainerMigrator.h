@@ -3,6 +3,8 @@
 // client is served: bundle containers once, from the mobile user's home to the system's place and to the installer's
 // ownership; well-known system containers to their fixed names, each time.
 //
+// No marker is written while something could not be read or written that the next boot may be able to.
+//
 // What a stop leaves: of the bundle migration, containers in either place, each whole, and no marker; the next boot
 // goes on where it stopped. Of the well-known one, containers under either name; the same. Takes no identifier locks.
 #pragma once
@@ -55,6 +57,8 @@ private:
     struct Count {
         std::uint64_t errors = 0;
         std::uint64_t migrated = 0;
+        /// Of the errors those that the next boot may not meet: no marker then.
+        std::uint64_t unfinished = 0;
         std::optional<ZORError> last;
     };
     void adoptBundlesOfClass(ContainerClass containerClass, Count& count);

@@ -80,7 +80,6 @@ struct OldDevice {
         device.daemon.reset();
         const files::path var = device.root.path() + "/private/var";
         put(var / "mobile/Containers/Bundle/Application" / bundleUuid, bundle, "com.example.bundle");
-        bundleRecord = textOf(var / "mobile/Containers/Bundle/Application" / bundleUuid / metadataName);
         put(var / "mobile/Containers/Data/Application" / dataUuid, data, "com.example.data",
             {{"com.veltra.Brevance.GroupContainerIDs", plist::Array{"group.old"}}});
         put(var / "containers/Data/System" / wellknownUuid, system, "com.veltra.settingsd");
@@ -92,7 +91,6 @@ struct OldDevice {
     platform::Disk& disk;
     ProcessResources before;
     Device device;
-    std::string bundleRecord;
 };
 
 std::uint64_t changesOf(StoreDaemon& daemon) {
@@ -102,7 +100,7 @@ std::uint64_t changesOf(StoreDaemon& daemon) {
     return changes;
 }
 
-/// What the old device must have become. A bundle whose record could not be written for once stays unknown, in place
+/// What the old device must have become. A bundle whose owner could not be changed for once stays as it is, in place
 /// and whole: the migration is not made again for its sake.
 enum class Bundle { known, inPlace };
 std::string judgeMigrated(const std::string& root, StoreDaemon& daemon, Bundle expected) {
@@ -129,15 +127,13 @@ std::string judgeMigrated(const std::string& root, StoreDaemon& daemon, Bundle e
     return expected == Bundle::known ? judgeStore(readTree(root, {"run"}), Transients::judged).complaint : "";
 }
 
-/// Only one error that hits the bundle's record or owner may leave that as it was; then the migration counts as done
-/// beside it.
+/// Only one error that hits the bundle's owner may leave that as it was; then the migration counts as done beside it.
 Bundle expectationAfter(const OldDevice& old, const FaultOutcome& outcome) {
     const files::path var = old.device.root.path() + "/private/var";
     const bool done = files::exists(var / "root/Library/Zorvane/zor_bundle_migration_complete.plist");
     const files::path place = var / "containers/Bundle/Application" / bundleUuid;
     struct stat status{};
-    const bool asItWas = textOf(place / metadataName) == old.bundleRecord ||
-                         (::lstat(place.c_str(), &status) == 0 && status.st_uid == bundle.owner);
+    const bool asItWas = ::lstat(place.c_str(), &status) == 0 && status.st_uid == bundle.owner;
     const bool oneError = !outcome.stopped && outcome.fault.span == FaultSpan::once;
     return done && asItWas && oneError ? Bundle::inPlace : Bundle::known;
 }
