@@ -126,6 +126,22 @@ Result<std::string> pathIn(const Result<plist::Dictionary>& reply) {
     return *path;
 }
 
+/// False when the reply is none to a listing.
+bool appendListed(const plist::Dictionary& reply, std::vector<ListedContainer>& containers) {
+    const plist::Array* identifiers = reply.array(keys::replyIdsArray);
+    const plist::Array* uuids = reply.array(keys::replyUUIDsArray);
+    if (!identifiers || !uuids || identifiers->size() != uuids->size())
+        return false;
+    for (std::size_t i = 0; i < identifiers->size(); ++i) {
+        const std::string* identifier = (*identifiers)[i].asString();
+        const auto uuid = ipc::uuidOf(&(*uuids)[i]);
+        if (!identifier || !uuid)
+            return false;
+        containers.push_back({.uuid = *uuid, .identifier = *identifier});
+    }
+    return true;
+}
+
 Result<Client::GroupPaths> groupPathsIn(const Result<plist::Dictionary>& reply) {
     if (!reply)
         return std::unexpected(reply.error());
@@ -219,21 +235,19 @@ Result<std::vector<ListedContainer>> Client::list(std::uint64_t containerClass, 
     message.set(keys::containerClass, containerClass);
     message.set(keys::userId, user);
     message.set(keys::transient, transient);
-    const auto reply = connection_->call(message);
-    if (!reply)
-        return std::unexpected(reply.error());
-    const plist::Array* identifiers = reply->array(keys::replyIdsArray);
-    const plist::Array* uuids = reply->array(keys::replyUUIDsArray);
-    if (!identifiers || !uuids || identifiers->size() != uuids->size())
-        return incomplete();
     std::vector<ListedContainer> containers;
-    containers.reserve(identifiers->size());
-    for (std::size_t i = 0; i < identifiers->size(); ++i) {
-        const std::string* identifier = (*identifiers)[i].asString();
-        const auto uuid = ipc::uuidOf(&(*uuids)[i]);
-        if (!identifier || !uuid)
+    // A daemon that knows no pages answers with the whole list, and names no next one.
+    for (std::optional<std::string> page = ""; page;) {
+        message.set(keys::pageAfter, *page);
+        const auto reply = connection_->call(message);
+        if (!reply)
+            return std::unexpected(reply.error());
+        if (!appendListed(*reply, containers))
             return incomplete();
-        containers.push_back({.uuid = *uuid, .identifier = *identifier});
+        const std::string* next = reply->string(keys::replyNextPage);
+        if (next && *next <= *page) // the list would never end
+            return incomplete();
+        page = next ? std::optional(*next) : std::nullopt;
     }
     return containers;
 }

@@ -65,6 +65,8 @@ void Daemon::setUp() {
     const platform::Platform& platform = composition_.platform();
     const Log& log = composition_.log();
     const auto& client = composition_.sharedClientConnection();
+    if (options_.containersPerUser)
+        composition_.store().limits.containersMaxPerUser = *options_.containersPerUser;
     const platform::BootMarker::State marker = platform.bootMarker.look();
     if (marker.foreign)
         log.write(logLevelError, "main", "Semaphore %s belongs to somebody else; it counts as absent",

@@ -8,7 +8,9 @@
 #include "daemon/Composition.h"
 #include "platform/ServiceTransaction.h"
 
+#include <cstddef>
 #include <functional>
+#include <optional>
 
 namespace zor {
 
@@ -16,6 +18,8 @@ class Daemon {
 public:
     struct Options {
         int logLevel = logLevelNotice;
+        /// Absent: as StoreLimits has it.
+        std::optional<std::size_t> containersPerUser;
         /// Runs when all is set up, before the first client can connect: opens what else is served.
         std::function<void()> beforeClients;
         /// Runs when clients can connect, before the run loop: tells the service manager.

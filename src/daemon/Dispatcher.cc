@@ -2,7 +2,10 @@
 #include "daemon/Dispatcher.h"
 
 #include "entitlements/ZOREntitlementMapping.h"
+#include "ipc/Identifier.h"
 #include "platform/EntitlementKeys.h"
+
+#include <algorithm>
 
 namespace zor {
 
@@ -24,6 +27,32 @@ std::vector<std::string> stringsIn(const plist::Array& array) {
         if (const std::string* text = element.asString())
             strings.push_back(*text);
     return strings;
+}
+
+bool isIdentifierOrNoString(const plist::Value* value) {
+    const std::string* text = value ? value->asString() : nullptr;
+    return !text || ipc::isIdentifier(*text);
+}
+
+/// No identifier of the request is longer than one may be, whatever the command makes of it. Else the context has its
+/// error.
+bool identifiersAreUsable(CommandContext& context) {
+    const plist::Dictionary& request = context.request;
+    for (const std::string_view key : {ipc::keys::identifier, ipc::keys::groupIdentifier, ipc::keys::oldIdentifier,
+                                       ipc::keys::newIdentifier, ipc::keys::pageAfter, ipc::keys::identifiersArray}) {
+        const plist::Value* value = request.find(key);
+        const plist::Array* array = value ? value->asArray() : nullptr;
+        if (isIdentifierOrNoString(value) &&
+            (!array || std::ranges::all_of(*array, isIdentifierOrNoString, [](const plist::Value& v) { return &v; })))
+            continue;
+        const std::string shown(key);
+        context.error = makeError(context.log, {handlerName, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
+                                  "Can't act on an invalid object: %s is longer than the %zu bytes of an identifier",
+                                  shown.c_str(), ipc::identifierBytesMax)
+                            .replyCode();
+        return false;
+    }
+    return true;
 }
 
 } // namespace
@@ -73,8 +102,10 @@ bool Dispatcher::serve(platform::PeerConnection& connection, platform::ServiceEv
                            .services = services_,
                            .log = log_,
                            .error = error};
-    row.handler(context);
-    if (row.replyFlag == ReplyFlag::dispatcherReplies) {
+    const bool usable = identifiersAreUsable(context);
+    if (usable)
+        row.handler(context);
+    if (!usable || row.replyFlag == ReplyFlag::dispatcherReplies) {
         reply.set(ipc::keys::replyError, static_cast<std::uint64_t>(error));
         event.reply->send(reply);
     }

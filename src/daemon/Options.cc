@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/Options.h"
 
+#include <charconv>
 #include <cstring>
 #include <getopt.h>
 
@@ -12,6 +13,7 @@ constexpr int usageExitStatus = 2;
 
 constexpr const char* help =
     R"(Usage: zorvaned [--root DIR] [--foreground] [--log-level N] [--forget-boot]
+                [--containers-per-user N]
 
 Keeps the containers of every application, extension and service of a device.
 
@@ -21,6 +23,9 @@ Keeps the containers of every application, extension and service of a device.
   --foreground     write the log to standard error, too
   --log-level N    3 errors, 5 notable events (the default), 7 debug traces
   --forget-boot    do the work of a first launch after a boot once more
+  --containers-per-user N
+                   containers that one user may have before clients other than
+                   the owner of the root can make no more; 100000 by default
   --help           show this text
   --version        show the version
 
@@ -40,6 +45,16 @@ bool parseLevel(const char* text, int& level) {
     return true;
 }
 
+bool parseCount(const char* text, std::optional<std::size_t>& count) {
+    const char* end = text + std::strlen(text);
+    std::size_t number = 0;
+    const auto [parsedTo, failure] = std::from_chars(text, end, number);
+    if (failure != std::errc() || parsedTo != end)
+        return false;
+    count = number;
+    return true;
+}
+
 } // namespace
 
 std::expected<DaemonOptions, OptionsEnd> parseDaemonOptions(int argumentCount, char** arguments) {
@@ -48,6 +63,7 @@ std::expected<DaemonOptions, OptionsEnd> parseDaemonOptions(int argumentCount, c
         {"foreground", no_argument, nullptr, 'f'},
         {"log-level", required_argument, nullptr, 'l'},
         {"forget-boot", no_argument, nullptr, 'b'},
+        {"containers-per-user", required_argument, nullptr, 'c'},
         {"help", no_argument, nullptr, 'h'},
         {"version", no_argument, nullptr, 'v'},
         {nullptr, 0, nullptr, 0},
@@ -71,6 +87,10 @@ std::expected<DaemonOptions, OptionsEnd> parseDaemonOptions(int argumentCount, c
         case 'l':
             if (!parseLevel(optarg, options.logLevel))
                 return std::unexpected(usage(std::string("log level '") + optarg + "' is not a number from 0 to 7"));
+            break;
+        case 'c':
+            if (!parseCount(optarg, options.containersPerUser))
+                return std::unexpected(usage(std::string("'") + optarg + "' is no number of containers"));
             break;
         case 'b':
             options.forgetBoot = true;

@@ -2,7 +2,9 @@
 // What the daemon is told on its command line.
 #pragma once
 
+#include <cstddef>
 #include <expected>
+#include <optional>
 #include <string>
 
 namespace zor {
@@ -12,6 +14,8 @@ struct DaemonOptions {
     bool foreground = false;
     int logLevel = 5;
     bool forgetBoot = false;
+    /// Of one user; see StoreLimits.
+    std::optional<std::size_t> containersPerUser;
 };
 
 /// Why the daemon does not start from this command line: a text to show and the exit status (0 for --help and

@@ -65,6 +65,8 @@ public:
     [[nodiscard]] const std::optional<std::string>& clientBundleIdentifier() const { return client_.bundleIdentifier; }
     [[nodiscard]] std::uint32_t clientUserId() const { return client_.userId; }
     [[nodiscard]] bool onlyOwnIdentifier() const { return client_.onlyOwnIdentifier; }
+    /// An owner of the root, as whom root and the daemon's own user are reported.
+    [[nodiscard]] bool ownsRoot() const { return client_.userId == 0; }
     // What the client may look up beyond its own; handlers widen or narrow it. Any thread: the daemon's own client is
     // used by several.
     [[nodiscard]] bool allowOtherIdLookup() const { return allowOtherIdLookup_; }
@@ -77,8 +79,11 @@ public:
         bool createIfNecessary = false;
         bool transient = false;
         UseLocking useLocking = UseLocking::yes;
+        /// It is made to take the place of another of the user's, so the user's share does not count.
+        bool replacesAnother = false;
     };
-    /// The container of (user, identifier, class), created if asked. With locking it runs under the all-identifiers
+    /// The container of (user, identifier, class), created if asked; error 38 where its user has as many as one may
+    /// have and the client does not own the root. With locking it runs under the all-identifiers
     /// lock held for writing. Without, the caller holds that lock, and calls makeDurable on what it got when it has
     /// released it and before it tells anybody. `identifier` nullptr: error 11.
     Result<FoundContainer> createOrLookupContainerForUser(std::uint32_t userId, const std::string* identifier,
@@ -180,6 +185,15 @@ public:
     /// Under the all-identifiers lock held for reading.
     Result<std::vector<ListedContainer>> containersForUser(std::uint32_t userId, ContainerClass containerClass,
                                                            bool transient);
+    struct ListedPage {
+        std::vector<ListedContainer> containers;
+        /// The `after` of the next page; absent when there is none.
+        std::optional<std::string> next;
+    };
+    /// The same, limits.listPageMax at a time, in the order of the identifiers' bytes: those behind `after`, which is
+    /// empty for the first page. What is made or goes between two pages may be listed or not; all else is, once.
+    Result<ListedPage> containersForUser(std::uint32_t userId, ContainerClass containerClass, bool transient,
+                                         const std::string& after);
 
     // Death row (DeathRow.cc).
     /// Moves an item away; a missing one is no failure. Error 41.
@@ -202,8 +216,11 @@ public:
                                             ContainerClass containerClass, const std::optional<FileURL>& url);
 
 private:
+    Result<void> checkListedClass(std::uint32_t userId, ContainerClass containerClass);
     Result<FoundContainer> createOrLookup(std::uint32_t userId, const std::string& identifier,
                                           ContainerClass containerClass, const CreateOrLookupOptions& options);
+    /// Error 38 when the user of the container has as many as one may have.
+    Result<void> checkShare(std::uint32_t userId, const std::string& identifier);
     Result<void> discardTransient(const ZORMetadata& record, const std::string& identifier);
     Result<FoundContainer> create(std::uint32_t userId, const std::string& identifier, ContainerClass containerClass,
                                   bool transient);
@@ -240,6 +257,8 @@ private:
     Result<void> applyReplaceJournal(const ReplaceJournal& journal);
 
     Result<std::shared_ptr<ZORMetadata>> knownContainer(const char* function, const ContainerAddress& address);
+    /// Error 34 when the info values of the user's containers would take more than one user's may.
+    Result<void> checkInfoShare(const ZORMetadata& record, const plist::Dictionary& info);
     Result<void> checkAddress(const char* function, const ContainerAddress& address);
     Result<std::uint64_t> diskUsage(const ContainerAddress& address);
     /// What an earlier measurement left; the caller holds the container's lock.

@@ -138,6 +138,7 @@ int main(int argumentCount, char** arguments) {
         (*platform)->peers(), (*platform)->runLoop(),
         [&](platform::Peer& peer, platform::StatusSocket::Detail detail) { return status.forPeer(peer, detail); });
     Daemon daemon(composition, {.logLevel = options->logLevel,
+                                .containersPerUser = options->containersPerUser,
                                 .beforeClients = [&] { openStatus(**platform, statusSocket, composition.log()); },
                                 .ready = [&] { (void)notify.send("READY=1"); }});
     const int exitStatus = daemon.run();

@@ -40,6 +40,10 @@ inline constexpr std::string_view systemGroupPrefix = "systemgroup.";
 /// Far above any device's map (a thousand identifiers take about a megabyte), far below what reading could not bear.
 inline constexpr std::size_t entitlementFileBytesMax = std::size_t{64} << 20;
 
+/// Groups of one type that an identifier may be entitled to. Their containers are made, and looked up, in one go for
+/// whoever asks for their paths; nobody has more than a few.
+inline constexpr std::size_t groupsMax = 1'000;
+
 /// The map. POSIX error, not logged: ENOENT when there is no file.
 Result<plist::Dictionary> readEntitlementFile(const FileURL& url, ZORFileManager& fileManager);
 

@@ -9,6 +9,7 @@
 #include "daemon/base/UserIdentity.h"
 #include "entitlements/ZOREntitlementMapping.h"
 #include "entitlements/ZORGroupManager.h"
+#include "ipc/Identifier.h"
 #include "ipc/Keys.h"
 #include "store/StoreServices.h"
 
@@ -29,7 +30,29 @@ const plist::Value* parentIn(const plist::Dictionary* options) {
 
 bool canBeProcessed(const std::string& identifier, const plist::Dictionary* options) {
     const plist::Value* parent = parentIn(options);
-    return !entitlementMapKeys::isOne(identifier) && (!parent || parent->asString());
+    const std::string* parentIdentifier = parent ? parent->asString() : nullptr;
+    return !entitlementMapKeys::isOne(identifier) && ipc::isIdentifier(identifier) &&
+           (!parent || (parentIdentifier && ipc::isIdentifier(*parentIdentifier)));
+}
+
+bool isGroupOrNoString(const plist::Value& value) {
+    const std::string* text = value.asString();
+    return !text || ipc::isIdentifier(*text);
+}
+
+/// Why the groups of the entitlements are none that containers can be made for; nullptr when they are. What is of
+/// another type is judged where it is read.
+const char* whyGroupsAreUnusable(const plist::Dictionary* entitlements) {
+    for (const std::string_view key :
+         {entitlementKeys::applicationGroups, entitlementKeys::systemGroups, entitlementKeys::systemGroupContainers}) {
+        const plist::Value* groups = entitlements ? entitlements->find(key) : nullptr;
+        const plist::Array* array = groups ? groups->asArray() : nullptr;
+        if (array && array->size() > groupsMax)
+            return "more groups than one identifier may have";
+        if ((groups && !isGroupOrNoString(*groups)) || (array && !std::ranges::all_of(*array, isGroupOrNoString)))
+            return "a group that is longer than an identifier may be";
+    }
+    return nullptr;
 }
 
 /// What is stored under the map's own keys is the daemon's; anything else there counts as nothing.
@@ -167,6 +190,10 @@ ErrorCode ZOREntitlementMapping::_onQueue_processEntitlements(const plist::Dicti
             return makeError(log_, {processFunction, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
                              "Can't act on an invalid object: ID: %s, parent ID: %s", ZOR_SHOWN(identifier),
                              plist::describe(parentIn(options)).c_str())
+                .replyCode();
+        if (const char* why = whyGroupsAreUnusable(entitlements))
+            return makeError(log_, {processFunction, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
+                             "Can't act on an invalid object: ID: %s: %s", ZOR_SHOWN(identifier), why)
                 .replyCode();
         const auto processed = _onQueue_process(entitlements, identifier, options);
         return processed ? ErrorCode::success : processed.error().replyCode();

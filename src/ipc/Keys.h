@@ -42,13 +42,15 @@ inline constexpr std::uint64_t replySuccess = 1;
 namespace keys {
 
 // Requests.
-inline constexpr std::string_view command = "Command";                             // u64; absent reads as 0
-inline constexpr std::string_view containerClass = "ContainerClass";               // u64
-inline constexpr std::string_view userId = "UserID";                               // u64
-inline constexpr std::string_view identifier = "Identifier";                       // string
-inline constexpr std::string_view uuid = "UUID";                                   // UUID
-inline constexpr std::string_view createIfNecessary = "CreateIfNecessary";         // boolean
-inline constexpr std::string_view transient = "Transient";                         // boolean
+inline constexpr std::string_view command = "Command";                     // u64; absent reads as 0
+inline constexpr std::string_view containerClass = "ContainerClass";       // u64
+inline constexpr std::string_view userId = "UserID";                       // u64
+inline constexpr std::string_view identifier = "Identifier";               // string
+inline constexpr std::string_view uuid = "UUID";                           // UUID
+inline constexpr std::string_view createIfNecessary = "CreateIfNecessary"; // boolean
+inline constexpr std::string_view transient = "Transient";                 // boolean
+/// String: the list comes in pages; empty for the first one, then what the reply before gave.
+inline constexpr std::string_view pageAfter = "PageAfter";
 inline constexpr std::string_view oldContainerUUID = "OldContainerUUID";           // UUID
 inline constexpr std::string_view oldContainerClass = "OldContainerClass";         // u64
 inline constexpr std::string_view oldIdentifier = "OldIdentifier";                 // string
@@ -79,13 +81,15 @@ inline constexpr std::string_view registeredByCallerOption =
 inline constexpr std::string_view placeholderOption = "com.veltra.Zorvane.PlaceholderEntitlements"; // boolean
 
 // Replies.
-inline constexpr std::string_view replyError = "ReplyError";                                 // u64, in every reply
-inline constexpr std::string_view replyUUID = "ReplyUUID";                                   // UUID
-inline constexpr std::string_view replyExisted = "ReplyExisted";                             // boolean
-inline constexpr std::string_view replyPath = "ReplyPath";                                   // string
-inline constexpr std::string_view replyIdentifier = "ReplyIdentifier";                       // string
-inline constexpr std::string_view replyIdsArray = "ReplyIdsArray";                           // array of strings
-inline constexpr std::string_view replyUUIDsArray = "ReplyUUIDsArray";                       // array of UUID
+inline constexpr std::string_view replyError = "ReplyError";           // u64, in every reply
+inline constexpr std::string_view replyUUID = "ReplyUUID";             // UUID
+inline constexpr std::string_view replyExisted = "ReplyExisted";       // boolean
+inline constexpr std::string_view replyPath = "ReplyPath";             // string
+inline constexpr std::string_view replyIdentifier = "ReplyIdentifier"; // string
+inline constexpr std::string_view replyIdsArray = "ReplyIdsArray";     // array of strings
+inline constexpr std::string_view replyUUIDsArray = "ReplyUUIDsArray"; // array of UUID
+/// String, where another page follows: its "PageAfter".
+inline constexpr std::string_view replyNextPage = "ReplyNextPage";
 inline constexpr std::string_view replyInfoValue = "ReplyInfoValue";                         // any
 inline constexpr std::string_view replyTransient = "ReplyTransient";                         // boolean
 inline constexpr std::string_view replyInfoDictionary = "ReplyInfoDictionary";               // dictionary

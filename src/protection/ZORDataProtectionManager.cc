@@ -105,6 +105,7 @@ ZORDataProtectionManager::prepare(const Request& request, const Completion& comp
     if (current == request.dataProtectionClass)
         return std::shared_ptr<Operation>();
     TRY(checkClass(request));
+    TRY(checkBound(request));
     auto operation = std::make_shared<Operation>(services_, container, request.dataProtectionClass,
                                                  request.retryIfLocked ? Operation::RetryIfLocked::yes
                                                                        : Operation::RetryIfLocked::no,
@@ -148,6 +149,18 @@ Result<void> ZORDataProtectionManager::checkClass(const Request& request) {
         return makeError(services_.log, {function, __LINE__}, ErrorCode::valueNotAllowed, nullptr, LogFlag::yes,
                          "Data protection class %d is invalid for 2nd and 3rd party apps", requested);
     return {};
+}
+
+Result<void> ZORDataProtectionManager::checkBound(const Request& request) {
+    const auto changes = [&] {
+        const MutexLock lock(mutex_);
+        return pending_.size();
+    }();
+    if (request.byOwner || changes < services_.limits.protectionChangesMax)
+        return {};
+    return makeError(services_.log, {function, __LINE__}, ErrorCode::lockedAndNotRetried, nullptr, LogFlag::yes,
+                     "%llu changes of protection wait already, and no more may; ask again after an unlock",
+                     static_cast<unsigned long long>(changes));
 }
 
 void ZORDataProtectionManager::finish(Change& change, bool wasLocked, const std::optional<ZORError>& error) {

@@ -35,6 +35,8 @@ public:
         std::int32_t dataProtectionClass = 0;
         bool isSecondOrThirdPartyApp = false;
         bool retryIfLocked = false;
+        /// Asked for by an owner of the root, whom no bound keeps out.
+        bool byOwner = false;
     };
     using Completion = std::function<void(ErrorCode)>;
 
@@ -64,6 +66,8 @@ private:
                                                                       const Completion& completion);
     Result<std::shared_ptr<const ZORMetadata>> containerOf(const Request& request);
     Result<void> checkClass(const Request& request);
+    /// Error 61 when too many wait already.
+    Result<void> checkBound(const Request& request) ZOR_EXCLUDES(mutex_);
     void finish(Change& change, bool wasLocked, const std::optional<ZORError>& error);
     void record(const Change& change);
 

@@ -12,6 +12,7 @@
 #include "platform/TerminationAssertionService.h"
 #include "platform/WorkQueue.h"
 #include "store/SetupReport.h"
+#include "store/StoreLimits.h"
 #include "store/ZORContainerCache.h"
 #include "store/ZORGlobalConfiguration.h"
 
@@ -49,6 +50,7 @@ struct StoreServices {
     /// The daemon's own client. It is made over these services, so it comes last; nothing runs before it is there.
     std::shared_ptr<ZORClientConnection> sharedClientConnection;
     SetupReport setup{};
+    StoreLimits limits{};
 };
 
 /// Runs `job` later on a queue; the daemon counts as busy until it has run.

@@ -4,9 +4,11 @@
 #include "daemon/base/UserIdentity.h"
 #include "fs/OwnedFile.h"
 #include "platform/BlockingScope.h"
+#include "plist/HeldBytes.h"
 #include "store/ClassDirectoryReader.h"
 #include "store/Names.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <fcntl.h>
 
@@ -60,7 +62,7 @@ Result<ZORContainerCache::ClassCache> ZORContainerCache::readClassDirectory(cons
     ClassCache cache;
     TRY(reader.forEach([&](Record record) {
         record->setTransient(key.transient);
-        store(cache, std::move(record));
+        store(cache, entryOf(std::move(record)));
     }));
     // A daemon that was killed may have left containers here that are not on the disk yet; who finds one here is told
     // that it exists.
@@ -71,11 +73,24 @@ Result<ZORContainerCache::ClassCache> ZORContainerCache::readClassDirectory(cons
     return cache;
 }
 
-void ZORContainerCache::store(ClassCache& cache, Record record) {
-    const auto known = cache.find(record);
-    if (known != cache.end())
-        cache.erase(known);
-    cache.insert(std::move(record));
+ZORContainerCache::Entry ZORContainerCache::entryOf(Record record) {
+    const std::size_t bytes = record->info() ? plist::heldBytes(*record->info()) : 0;
+    return {.record = std::move(record), .infoBytes = bytes};
+}
+
+void ZORContainerCache::store(ClassCache& cache, Entry entry) {
+    remove(cache, entry.record->identifier());
+    const std::size_t bytes = entry.infoBytes;
+    cache.entries.insert(std::move(entry));
+    cache.infoBytes += bytes;
+}
+
+void ZORContainerCache::remove(ClassCache& cache, std::string_view identifier) {
+    const auto known = cache.entries.find(identifier);
+    if (known == cache.entries.end())
+        return;
+    cache.infoBytes -= known->infoBytes;
+    cache.entries.erase(known);
 }
 
 Result<ZORContainerCache::Found> ZORContainerCache::findRecord(const Key& key, const std::string& identifier) {
@@ -83,12 +98,12 @@ Result<ZORContainerCache::Found> ZORContainerCache::findRecord(const Key& key, c
     const auto cache = _getCacheForUserId(key);
     if (!cache)
         return failedToRebuild({"containerForUser", __LINE__}, key, cache.error());
-    const auto found = (*cache)->find(std::string_view(identifier));
-    if (found == (*cache)->end())
+    const auto found = (*cache)->entries.find(std::string_view(identifier));
+    if (found == (*cache)->entries.end())
         return makeError(log_, {"containerForUser", __LINE__}, ErrorCode::notFound, nullptr, LogFlag::no,
                          "Cache: %s%s: Container Not Found with ID: %s", className(key.containerClass),
                          suffix(key.transient), ZOR_SHOWN(identifier));
-    return Found{.record = *found, .place = (*found)->place()};
+    return Found{.record = found->record, .place = found->record->place()};
 }
 
 Result<void> ZORContainerCache::checkOnDisk(Here here, const Key& key, const Found& found,
@@ -170,21 +185,93 @@ ZORContainerCache::allContainersForUser(std::uint32_t userId, ContainerClass con
             const auto cache = _getCacheForUserId(key);
             if (!cache)
                 return failedToRebuild(here, key, cache.error());
-            all.reserve((*cache)->size());
-            for (const Record& record : **cache)
-                all.push_back({.record = record, .place = record->place()});
+            all.reserve((*cache)->entries.size());
+            for (const Entry& entry : (*cache)->entries)
+                all.push_back({.record = entry.record, .place = entry.record->place()});
         }
-        std::vector<Record> records;
-        records.reserve(all.size());
-        for (Found& found : all) {
-            const auto there = checkOnDisk(here, key, found, "ALL Found");
-            if (!there && there.error().isOwnShortage())
-                return there.error();
-            if (there)
-                records.push_back(std::move(found.record));
-        }
-        return records;
+        return thoseOnDisk(here, key, std::move(all));
     });
+}
+
+Result<std::vector<ZORContainerCache::Record>> ZORContainerCache::thoseOnDisk(Here here, const Key& key,
+                                                                              std::vector<Found> found) {
+    std::vector<Record> records;
+    records.reserve(found.size());
+    for (Found& one : found) {
+        const auto there = checkOnDisk(here, key, one, "ALL Found");
+        if (!there && there.error().isOwnShortage())
+            return there.error();
+        if (there)
+            records.push_back(std::move(one.record));
+    }
+    return records;
+}
+
+Result<ZORContainerCache::PageOfRecords> ZORContainerCache::pageOfContainersForUser(std::uint32_t userId,
+                                                                                    ContainerClass containerClass,
+                                                                                    bool transient, const Page& page) {
+    return boundary_.run(ZOR_HERE, [&]() -> Result<PageOfRecords> {
+        const Here here{"allContainersForUser", __LINE__};
+        if (!isValidClass(containerClass))
+            return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
+                             "Invalid Content Class: %ld", number(containerClass));
+        const Key key{userId, containerClass, transient};
+        const auto before = [](const Record& left, const Record& right) {
+            return left->identifier() < right->identifier();
+        };
+        std::vector<Found> found;
+        PageOfRecords result;
+        {
+            const MutexLock held(cacheLock_);
+            const auto cache = _getCacheForUserId(key);
+            if (!cache)
+                return failedToRebuild(here, key, cache.error());
+            std::vector<Record> records;
+            records.reserve((*cache)->entries.size());
+            for (const Entry& entry : (*cache)->entries)
+                if (page.after.empty() || entry.record->identifier() > page.after)
+                    records.push_back(entry.record);
+            const auto end =
+                records.begin() + static_cast<std::ptrdiff_t>(std::min(records.size(), page.containersMax));
+            std::partial_sort(records.begin(), end, records.end(), before);
+            if (end != records.end())
+                result.next = end[-1]->identifier();
+            for (auto record = records.begin(); record != end; ++record)
+                found.push_back({.record = *record, .place = (*record)->place()});
+        }
+        result.records = TRY(thoseOnDisk(here, key, std::move(found)));
+        return result;
+    });
+}
+
+bool ZORContainerCache::buildAllOfUser(std::uint32_t userId) {
+    bool shortage = false;
+    for (std::uint64_t number = 1; ipc::isContainerClass(number); ++number)
+        for (const bool transient : {false, true}) {
+            const Key key{userId, static_cast<ContainerClass>(number), transient};
+            if (!userIdIsValidForClass(key.containerClass, userId))
+                continue;
+            // A directory that is missing is not made for this, and what cannot be read holds nothing in memory either.
+            const auto place = configuration_.placeOfClass(userId, key.containerClass, transient);
+            const auto directory = place ? fileManager_.resolver().openDirectory(*place) : std::unexpected(ENOENT);
+            if (directory)
+                (void)_getCacheForUserId(key);
+            shortage = shortage || (!directory && isOwnShortage(directory.error()));
+        }
+    return !shortage;
+}
+
+ZORContainerCache::Held ZORContainerCache::heldByUser(std::uint32_t userId) {
+    const MutexLock held(cacheLock_);
+    if (!wholeUsers_.contains(userId) && buildAllOfUser(userId))
+        wholeUsers_.insert(userId);
+    Held all;
+    for (auto cache = caches_.lower_bound(Key{userId, ContainerClass::undefined, false});
+         cache != caches_.end() && cache->first.userId == userId; ++cache) {
+        all.containers += cache->second.entries.size();
+        all.infoBytes += cache->second.infoBytes;
+    }
+    return all;
 }
 
 Result<void> ZORContainerCache::addContainerMetadata(const Record& record, std::uint32_t userId, ContainerPlace place,
@@ -198,13 +285,14 @@ Result<void> ZORContainerCache::addContainerMetadata(const Record& record, std::
             return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes, "Invalid input: URL: %s",
                              "(null)");
         const Key key{userId, record->containerClass(), transient};
+        Entry entry = entryOf(record);
         {
             const MutexLock held(cacheLock_);
             const auto cache = _getCacheForUserId(key);
             if (!cache)
                 return failedToRebuild(here, key, cache.error());
             record->setPlace(std::move(place));
-            store(**cache, record);
+            store(**cache, std::move(entry));
         }
         traceIdentifier(here, key, "Added", record->identifier());
         return {};
@@ -227,9 +315,7 @@ Result<void> ZORContainerCache::removeContainerForUser(std::uint32_t userId, Con
             const auto cache = _getCacheForUserId(key);
             if (!cache)
                 return failedToRebuild(here, key, cache.error());
-            const auto known = (*cache)->find(std::string_view(*identifier));
-            if (known != (*cache)->end())
-                (*cache)->erase(known);
+            remove(**cache, *identifier);
         }
         traceIdentifier(here, key, "Removed", *identifier);
         return {};
@@ -239,13 +325,14 @@ Result<void> ZORContainerCache::removeContainerForUser(std::uint32_t userId, Con
 void ZORContainerCache::dropAll() {
     const MutexLock held(cacheLock_);
     caches_.clear();
+    wholeUsers_.clear();
 }
 
 ZORContainerCache::Counts ZORContainerCache::counts() {
     const MutexLock held(cacheLock_);
     Counts counts{.classCaches = caches_.size()};
     for (const auto& [key, cache] : caches_)
-        counts.records += cache.size();
+        counts.records += cache.entries.size();
     return counts;
 }
 

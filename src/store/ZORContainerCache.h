@@ -21,6 +21,8 @@
 
 #include <map>
 #include <memory>
+#include <optional>
+#include <set>
 #include <string>
 #include <string_view>
 #include <unordered_set>
@@ -49,6 +51,19 @@ public:
     /// Every record whose metadata file is still there. Want of descriptors or memory makes none go missing: error 44.
     Result<std::vector<Record>> allContainersForUser(std::uint32_t userId, ContainerClass containerClass,
                                                      bool transient);
+    struct Page {
+        std::string after;
+        std::size_t containersMax;
+    };
+    struct PageOfRecords {
+        std::vector<Record> records;
+        /// The identifier behind which the next page begins; absent when there is none.
+        std::optional<std::string> next;
+    };
+    /// Of those, in the order of their identifiers' bytes, the first `containersMax` behind `after`; an empty one is
+    /// before all. Looks at no metadata file of others.
+    Result<PageOfRecords> pageOfContainersForUser(std::uint32_t userId, ContainerClass containerClass, bool transient,
+                                                  const Page& page);
     /// Stores the record under its identifier, at `place`, over any other of that identifier.
     Result<void> addContainerMetadata(const Record& record, std::uint32_t userId, ContainerPlace place, bool transient);
     Result<void> removeContainerForUser(std::uint32_t userId, ContainerClass containerClass,
@@ -56,6 +71,14 @@ public:
 
     /// Forgets every class cache; each is built anew when it is next needed.
     void dropAll() ZOR_EXCLUDES(cacheLock_);
+    /// What a user has, in classes of every kind, transient ones included. The first time that a user is asked for,
+    /// every class cache of the user's is built whose directory is there; later this is a sum over them.
+    struct Held {
+        std::size_t containers = 0;
+        /// Of memory, of the info values.
+        std::size_t infoBytes = 0;
+    };
+    [[nodiscard]] Held heldByUser(std::uint32_t userId) ZOR_EXCLUDES(cacheLock_);
     /// For the status: class caches and the records in them.
     struct Counts {
         std::size_t classCaches = 0;
@@ -64,14 +87,21 @@ public:
     [[nodiscard]] Counts counts() ZOR_EXCLUDES(cacheLock_);
 
 private:
+    struct Entry {
+        Record record;
+        std::size_t infoBytes; // of memory, as the record had when it was stored
+    };
     struct IdentifierOf {
         using is_transparent = void;
         static std::string_view of(std::string_view identifier) { return identifier; }
-        static std::string_view of(const Record& record) { return record->identifier(); }
+        static std::string_view of(const Entry& entry) { return entry.record->identifier(); }
         std::size_t operator()(const auto& key) const { return std::hash<std::string_view>()(of(key)); }
         bool operator()(const auto& left, const auto& right) const { return of(left) == of(right); }
     };
-    using ClassCache = std::unordered_set<Record, IdentifierOf, IdentifierOf>;
+    struct ClassCache {
+        std::unordered_set<Entry, IdentifierOf, IdentifierOf> entries;
+        std::size_t infoBytes = 0; // the sum of the entries'
+    };
     struct Key {
         std::uint32_t userId;
         ContainerClass containerClass;
@@ -81,6 +111,8 @@ private:
 
     Result<ClassCache*> _getCacheForUserId(const Key& key) ZOR_REQUIRES(cacheLock_);
     Result<ClassCache> readClassDirectory(const Key& key);
+    /// False when want of descriptors or memory left one unbuilt.
+    bool buildAllOfUser(std::uint32_t userId) ZOR_REQUIRES(cacheLock_);
     /// A record and where it lay when the cache was looked at. Another operation may move the container meanwhile; who
     /// holds the lock of this very container sees both agree.
     struct Found {
@@ -91,7 +123,10 @@ private:
     ZORError failedToRebuild(Here here, const Key& key, const ZORError& cause);
     /// Code 44 or 47 unless the record's metadata file is there.
     Result<void> checkOnDisk(Here here, const Key& key, const Found& found, const char* foundFormatPrefix);
-    static void store(ClassCache& cache, Record record);
+    Result<std::vector<Record>> thoseOnDisk(Here here, const Key& key, std::vector<Found> found);
+    static Entry entryOf(Record record);
+    static void store(ClassCache& cache, Entry entry);
+    static void remove(ClassCache& cache, std::string_view identifier);
     /// A level-7 line under the operation's own name, which a lambda inside it does not have.
     void traceIdentifier(Here here, const Key& key, const char* what, const std::string& identifier);
 
@@ -102,6 +137,8 @@ private:
     ExceptionBoundary& boundary_;
     platform::Mutex cacheLock_;
     std::map<Key, ClassCache> caches_ ZOR_GUARDED_BY(cacheLock_);
+    /// Users of whom every class cache has been built that could be.
+    std::set<std::uint32_t> wholeUsers_ ZOR_GUARDED_BY(cacheLock_);
 };
 
 } // namespace zor

@@ -136,6 +136,18 @@ std::optional<FileURL> ZORGlobalConfiguration::containerDirectoryURLForUser(std:
     return url;
 }
 
+std::optional<FileURL> ZORGlobalConfiguration::placeOfClass(std::uint32_t userId, ContainerClass containerClass,
+                                                            bool transient) {
+    std::optional<FileURL> home;
+    if (isPerUserClass(containerClass)) {
+        const RecursiveMutexLock held(lock_);
+        ZORPerUserConfiguration* user = getPerUserConfigurationForUserId(userId);
+        home = user ? user->userHomeDirectory() : std::nullopt;
+    }
+    const auto base = places_.baseOfClass(containerClass, transient, home);
+    return base ? std::optional(base->appendingDirectory(className(containerClass))) : std::nullopt;
+}
+
 const std::array<std::string_view, 4>& ZORGlobalConfiguration::appUserDataItemNames() {
     static constexpr std::array<std::string_view, 4> items = {"Documents", "Library", "tmp", "Tillwerk"};
     return items;

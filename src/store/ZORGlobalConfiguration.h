@@ -53,6 +53,9 @@ public:
     std::optional<FileURL> containerDirectoryURLForUser(std::uint32_t userId, ContainerClass containerClass,
                                                         bool transient);
 
+    /// Where it is, or would be; not made here.
+    std::optional<FileURL> placeOfClass(std::uint32_t userId, ContainerClass containerClass, bool transient);
+
     /// What a user keeps in an application's data container.
     [[nodiscard]] static const std::array<std::string_view, 4>& appUserDataItemNames();
 

@@ -3,6 +3,7 @@
 
 #include "fs/DictionaryFile.h"
 #include "fs/OwnedFile.h"
+#include "ipc/Identifier.h"
 #include "plist/Binary.h"
 #include "plist/Read.h"
 #include "store/Names.h"
@@ -108,7 +109,7 @@ std::expected<std::shared_ptr<ZORMetadata>, MetadataRefusal> parseMetadata(std::
                        place.url().c_str());
     }
     const std::string* identifier = content->string(identifierKey);
-    if (!identifier)
+    if (!identifier || !ipc::isIdentifier(*identifier))
         ZOR_REFUSE(identifier, "Invalid metadata Identifier: %s at %s",
                    plist::describe(content->find(identifierKey)).c_str(), place.url().c_str());
     const std::string* uuidString = content->string(uuidKey);

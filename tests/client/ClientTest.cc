@@ -70,15 +70,23 @@ public:
         ASSERT_EQ(::listen(listening_.get(), 1), 0);
         thread_ = std::thread([this, script = std::move(script)] {
             const FileDescriptor socket(::accept4(listening_.get(), nullptr, nullptr, SOCK_CLOEXEC));
-            std::array<std::uint8_t, ipc::frameHeaderBytes> header;
-            if (::recv(socket.get(), header.data(), header.size(), MSG_WAITALL) != ipc::frameHeaderBytes)
-                return;
-            const ipc::FrameHeader request = ipc::decodeFrameHeader(header);
-            EXPECT_TRUE(request.isValidRequest() && request.expectsReply());
-            plist::Data payload(request.payloadBytes);
-            EXPECT_EQ(::recv(socket.get(), payload.data(), payload.size(), MSG_WAITALL), std::ssize(payload));
-            script(socket.get(), request.id);
+            std::uint64_t id = 0;
+            if (!next(socket.get(), id).empty())
+                script(socket.get(), id);
         });
+    }
+    /// The next request; empty at the end of the stream.
+    static plist::Dictionary next(int socket, std::uint64_t& id) {
+        std::array<std::uint8_t, ipc::frameHeaderBytes> header;
+        if (::recv(socket, header.data(), header.size(), MSG_WAITALL) != ipc::frameHeaderBytes)
+            return {};
+        const ipc::FrameHeader request = ipc::decodeFrameHeader(header);
+        EXPECT_TRUE(request.isValidRequest() && request.expectsReply());
+        plist::Data payload(request.payloadBytes);
+        EXPECT_EQ(::recv(socket, payload.data(), payload.size(), MSG_WAITALL), std::ssize(payload));
+        id = request.id;
+        const auto value = plist::readBinary(payload);
+        return value && value->asDictionary() ? *value->asDictionary() : plist::Dictionary();
     }
     void leaveSocketBehind() {
         thread_.join(); // it holds the socket for as long as it accepts
@@ -217,6 +225,29 @@ TEST(Client, ListsAreJudged) {
         const auto list = daemon.connect().list(2, 501, false);
         EXPECT_EQ(list ? std::optional(list->size()) : std::nullopt, row.count);
         EXPECT_TRUE(list || list.error().kind == Kind::protocol);
+    }
+}
+
+// A list comes in as many pages as there are, and one that would not come to its end is refused.
+TEST(Client, ListsComeInPages) {
+    for (const bool ends : {true, false}) {
+        ScriptedDaemon daemon;
+        std::string asked;
+        daemon.serve([&](int socket, std::uint64_t id) {
+            plist::Dictionary page{{"ReplyError", std::uint64_t{1}},
+                                   {"ReplyIdsArray", plist::Array{"a"}},
+                                   {"ReplyUUIDsArray", plist::Array{plist::Data(16, 1)}},
+                                   {"ReplyNextPage", "a"}};
+            put(socket, reply(page, id));
+            const plist::Dictionary request = ScriptedDaemon::next(socket, id);
+            asked = request.string("PageAfter") ? *request.string("PageAfter") : "";
+            if (ends)
+                page.erase("ReplyNextPage");
+            put(socket, reply(page, id));
+        });
+        const auto list = daemon.connect().list(2, 501, false);
+        EXPECT_EQ(list ? list->size() : 0, ends ? 2U : 0U);
+        EXPECT_EQ(asked, "a");
     }
 }
 

@@ -19,7 +19,7 @@ const std::string executable = "<key>Executable</key><string>/usr/bin/agent</str
 
 // A file that is not wholly understood grants nothing.
 TEST(IdentityFile, RefusesWhatItDoesNotUnderstand) {
-    ASSERT_TRUE(parse(file(executable)));
+    ASSERT_TRUE(parse(file(executable + "<key>Identifier</key><string>" + std::string(1024, 'i') + "</string>")));
     const std::vector<std::string> wrong = {
         "",
         "not a property list",
@@ -32,6 +32,7 @@ TEST(IdentityFile, RefusesWhatItDoesNotUnderstand) {
         file("<key>Executable</key><array><string>/a</string></array>"),
         file(executable + "<key>Identifier</key><string></string>"),
         file(executable + "<key>Identifier</key><true/>"),
+        file(executable + "<key>Identifier</key><string>" + std::string(1025, 'i') + "</string>"),
         file(executable + "<key>UserIDs</key><integer>501</integer>"),
         file(executable + "<key>UserIDs</key><array><string>501</string></array>"),
         file(executable + "<key>UserIDs</key><array><integer>-1</integer></array>"),

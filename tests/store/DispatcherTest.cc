@@ -160,6 +160,33 @@ TEST_F(Dispatch, CreatesAndLooksUp) {
     EXPECT_EQ(errorOf(request({{"ContainerClass", 12}, {"UserID", 499}, {"CreateIfNecessary", true}})), 1U);
 }
 
+// Goal: an identifier longer than one may be is an invalid object, and so are more groups than one may have. Method:
+// every command with every key that holds identifiers.
+TEST_F(Dispatch, IdentifiersAndGroupsAreBounded) {
+    const std::string longest(1024, 'i');
+    const plist::Value tooLong(std::string(1025, 'i'));
+    as(grant("com.example", everything), 0);
+    const Dictionary rows{{"Identifier", tooLong},    {"OldIdentifier", tooLong},
+                          {"NewIdentifier", tooLong}, {"GroupIdentifier", tooLong},
+                          {"PageAfter", tooLong},     {"IdentifiersArray", Array{"a", tooLong}}};
+    for (std::uint64_t command = 0; command < commandTable.size(); ++command)
+        for (const auto& [key, value] : rows)
+            EXPECT_EQ(errorOf(request({{"Command", command}, {key, value}})), 11U) << command << key;
+    EXPECT_EQ(makeContainer(longest.c_str()).size(), 16U);
+    const auto registering = [&](plist::Value groups, plist::Value parent) {
+        return errorOf(request(
+            {{"Command", 18},
+             {"Identifier", "a"},
+             {"Entitlements", Dictionary{{appGroups, std::move(groups)}}},
+             {"OptionsDictionary", Dictionary{{std::string(ipc::keys::parentBundleIdOption), std::move(parent)}}}}));
+    };
+    EXPECT_EQ(registering(Array(1000, longest), longest), 1U);
+    EXPECT_EQ(registering(Array(1001, "g"), "p"), 11U);
+    EXPECT_EQ(registering(Array{"g", tooLong}, "p"), 11U);
+    EXPECT_EQ(registering(tooLong, "p"), 11U);
+    EXPECT_EQ(registering("g", tooLong), 11U);
+}
+
 TEST_F(Dispatch, Lists) {
     asInstaller();
     const Dictionary list{{"Command", 1}, {"ContainerClass", 2}, {"UserID", 1}};
@@ -175,6 +202,19 @@ TEST_F(Dispatch, Lists) {
     for (std::size_t i = 0; i < 3; ++i)
         listed[*reply.array("ReplyIdsArray")->at(i).asString()] = *reply.array("ReplyUUIDsArray")->at(i).asData();
     EXPECT_EQ(listed, uuids);
+    // The same in pages, whatever goes between two of them.
+    world.services().store().limits.listPageMax = 2;
+    Dictionary page = list;
+    page.set("PageAfter", "");
+    const Dictionary first = request(page);
+    EXPECT_EQ(*first.array("ReplyIdsArray"), (Array{"a", "b"}));
+    ASSERT_TRUE(first.string("ReplyNextPage"));
+    const std::string gone = "b";
+    ASSERT_TRUE(world.daemonsClient().deleteContainerForUser(mobile, &gone, application, false));
+    page.set("PageAfter", *first.string("ReplyNextPage"));
+    EXPECT_EQ(request(page), (Dictionary{{"ReplyError", std::uint64_t{1}},
+                                         {"ReplyIdsArray", Array{"c"}},
+                                         {"ReplyUUIDsArray", Array{uuids["c"]}}}));
     Dictionary transientOnes = list;
     transientOnes.set("Transient", true);
     EXPECT_EQ(request(transientOnes).array("ReplyIdsArray")->size(), 0U);

@@ -36,6 +36,7 @@ TEST_F(Metadata, RefusesByTheFirstFailingStep) {
         std::string message;
     };
     const std::string at = " at " + world.path(container);
+    const Value tooLong(std::string(1025, 'i'));
     const auto shown = [](const Value& value) { return plist::describe(&value); };
     const Row rows[] = {
         {"ZORMetadataPersona", 502, "Incorrect UserId: 502, expecting: 501" + at},
@@ -43,6 +44,7 @@ TEST_F(Metadata, RefusesByTheFirstFailingStep) {
         {"ZORMetadataPersona", "502 \"", "Incorrect UserId: 502 \", expecting: 501" + at},
         {"ZORMetadataIdentifier", {}, "Invalid metadata Identifier: (null)" + at},
         {"ZORMetadataIdentifier", 5, "Invalid metadata Identifier: 5" + at},
+        {"ZORMetadataIdentifier", tooLong, "Invalid metadata Identifier: " + shown(tooLong) + at},
         {"ZORMetadataUUID", {}, "Invalid metadata UUID String: (null)" + at},
         {"ZORMetadataUUID", 5, "Invalid metadata UUID String: 5" + at},
         {"ZORMetadataUUID", "nonsense", "Invalid metadata UUID: nonsense" + at},

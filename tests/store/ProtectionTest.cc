@@ -293,6 +293,23 @@ TEST_F(Protection, TheContainerChangesMeanwhile) {
     }
 }
 
+// Goal: changes that wait do not pile up, but for an owner of the root. Method: a small limit, and a locked device.
+TEST_F(Protection, OnlySoManyWait) {
+    world.services().store().limits.protectionChangesMax = 1;
+    lock();
+    Request request = to(1);
+    request.retryIfLocked = true;
+    Answers first;
+    manager().setDataProtectionOnDataContainerForUser(request, first.completion());
+    EXPECT_EQ(change(request), first.codes().empty() ? 61U : 0U);
+    request.byOwner = true;
+    Answers owners;
+    manager().setDataProtectionOnDataContainerForUser(request, owners.completion());
+    unlock();
+    EXPECT_EQ(first.codes(patience), std::vector<std::uint64_t>{1});
+    EXPECT_EQ(owners.codes(patience), std::vector<std::uint64_t>{1});
+}
+
 // Goal: nothing outside a container changes its class, whatever its owner puts in it or swaps while it is walked.
 // Method: links, a FIFO, hard links; then an owner that swaps a directory and a link while changes run.
 TEST_F(Protection, HostileOwner) {

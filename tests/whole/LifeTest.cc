@@ -30,9 +30,14 @@ TEST(Life, SecondDaemonAndSigtermAndBrokenCommandLines) {
     EXPECT_EQ(second.exitStatus, 1);
     EXPECT_NE(second.output.find("zorvaned: "), std::string::npos) << second.output;
     EXPECT_EQ(daemon.terminate(), 0);
-    const std::pair<std::vector<std::string>, int> rows[] = {
-        {{"--root"}, 2}, {{"--log-level", "x"}, 2}, {{"--nothing"}, 2},         {{"stray"}, 2},
-        {{"--help"}, 0}, {{"--version"}, 0},        {{"--root", "/nowhere"}, 1}};
+    const std::pair<std::vector<std::string>, int> rows[] = {{{"--root"}, 2},
+                                                             {{"--log-level", "x"}, 2},
+                                                             {{"--nothing"}, 2},
+                                                             {{"stray"}, 2},
+                                                             {{"--containers-per-user", "1x"}, 2},
+                                                             {{"--help"}, 0},
+                                                             {{"--version"}, 0},
+                                                             {{"--root", "/nowhere"}, 1}};
     for (const auto& [arguments, status] : rows) {
         std::vector<std::string> words = {programPath("zorvaned")};
         words.insert(words.end(), arguments.begin(), arguments.end());

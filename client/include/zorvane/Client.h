@@ -166,7 +166,7 @@ public:
     /// Replaces what is registered for an identifier.
     [[nodiscard]] Result<void> processEntitlements(const Registration& registration);
 
-    /// In no particular order.
+    /// In no particular order. The list is asked for in pages: what is made or goes meanwhile may be in it or not.
     [[nodiscard]] Result<std::vector<ListedContainer>> list(std::uint64_t containerClass, std::uint32_t user,
                                                             bool transient);
 

@@ -8,6 +8,23 @@ namespace zor::commands {
 
 namespace keys = ipc::keys;
 
+namespace {
+
+void replyWithList(CommandContext& context, const std::vector<ZORClientConnection::ListedContainer>& containers) {
+    plist::Array identifiers;
+    plist::Array uuids;
+    identifiers.reserve(containers.size());
+    uuids.reserve(containers.size());
+    for (const auto& container : containers) {
+        identifiers.emplace_back(container.identifier);
+        uuids.push_back(ipc::uuidValue(container.uuid.bytes()));
+    }
+    context.reply.set(keys::replyIdsArray, std::move(identifiers));
+    context.reply.set(keys::replyUUIDsArray, std::move(uuids));
+}
+
+} // namespace
+
 void createOrLookupContainer(CommandContext& context) {
     const ContainerClass containerClass = classOf(context.request, keys::containerClass);
     const auto user = userOf(context, keys::userId, containerClass);
@@ -35,22 +52,24 @@ void listContainers(CommandContext& context) {
     const auto user = userOf(context, keys::userId, containerClass);
     if (!user)
         return;
-    const auto listed =
-        context.client->containersForUser(*user, containerClass, context.request.isTrue(keys::transient));
-    if (!listed) {
-        context.error = listed.error().replyCode();
+    const bool transient = context.request.isTrue(keys::transient);
+    const std::string* after = context.request.string(keys::pageAfter);
+    if (!after) {
+        const auto all = context.client->containersForUser(*user, containerClass, transient);
+        if (all)
+            replyWithList(context, *all);
+        else
+            context.error = all.error().replyCode();
         return;
     }
-    plist::Array identifiers;
-    plist::Array uuids;
-    identifiers.reserve(listed->size());
-    uuids.reserve(listed->size());
-    for (const auto& container : *listed) {
-        identifiers.emplace_back(container.identifier);
-        uuids.push_back(ipc::uuidValue(container.uuid.bytes()));
+    const auto page = context.client->containersForUser(*user, containerClass, transient, *after);
+    if (!page) {
+        context.error = page.error().replyCode();
+        return;
     }
-    context.reply.set(keys::replyIdsArray, std::move(identifiers));
-    context.reply.set(keys::replyUUIDsArray, std::move(uuids));
+    replyWithList(context, page->containers);
+    if (page->next)
+        context.reply.set(keys::replyNextPage, *page->next);
 }
 
 void deleteContainersOnDeathRow(CommandContext& context) {

@@ -34,7 +34,8 @@ void setDataProtection(CommandContext& context) {
          .containerClass = containerClass,
          .dataProtectionClass = protectionClassIn(context.request),
          .isSecondOrThirdPartyApp = context.request.isTrue(keys::isThirdParty),
-         .retryIfLocked = context.request.isTrue(keys::retryIfLocked)},
+         .retryIfLocked = context.request.isTrue(keys::retryIfLocked),
+         .byOwner = context.client->ownsRoot()},
         reply);
 }
 

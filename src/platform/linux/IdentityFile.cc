@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/linux/IdentityFile.h"
 
+#include "ipc/Identifier.h"
 #include "platform/EntitlementKeys.h"
 #include "plist/Read.h"
 
@@ -73,6 +74,8 @@ Problem readGrant(const plist::Dictionary& file, RegistryEntry& entry) {
     auto grant = std::make_shared<IdentityGrant>();
     if (Problem problem = readString(file, keyIdentifier, grant->identifier))
         return problem;
+    if (grant->identifier && !ipc::isIdentifier(*grant->identifier))
+        return wrong(keyIdentifier, "longer than " + std::to_string(ipc::identifierBytesMax) + " bytes");
     if (const plist::Value* const value = file.find(keyEntitlements)) {
         const plist::Dictionary* const entitlements = value->asDictionary();
         if (!entitlements)

@@ -15,6 +15,7 @@
 #include "daemon/base/UserIdentity.h"
 #include "entitlements/ZOREntitlementMapping.h"
 #include "entitlements/ZORWhitelist.h"
+#include "ipc/Identifier.h"
 #include "platform/BlockingScope.h"
 #include "store/StoreServices.h"
 #include "store/operations/ContainerBuilder.h"
@@ -54,7 +55,7 @@ Result<void> ZORClientConnection::checkRequest(std::uint32_t userId, const std::
     constexpr Here here{"createOrLookupContainerForUser", __LINE__};
     const Log& log = services_.log;
     const long classNumber = static_cast<long>(containerClass);
-    if (!identifier || !isValidClass(containerClass))
+    if (!identifier || !ipc::isIdentifier(*identifier) || !isValidClass(containerClass))
         return makeError(log, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
                          "Can't act on an invalid object: userId: %u, ID: %s, class: %ld", userId,
                          ZOR_SHOWN(identifier), classNumber);
@@ -84,7 +85,23 @@ Result<FoundContainer> ZORClientConnection::createOrLookup(std::uint32_t userId,
     if (!options.createIfNecessary)
         return makeError(services_.log, {"createOrLookupContainerForUser", __LINE__}, ErrorCode::notFound, nullptr,
                          LogFlag::no, "Container with identifier: \"%s\" Not Found", ZOR_SHOWN(identifier));
+    // One in the place of another makes the user's share no larger.
+    if (!record && !options.replacesAnother)
+        TRY(checkShare(userId, identifier));
     return create(userId, identifier, containerClass, options.transient);
+}
+
+Result<void> ZORClientConnection::checkShare(std::uint32_t userId, const std::string& identifier) {
+    if (ownsRoot())
+        return {};
+    const std::size_t containers = services_.cache.heldByUser(userId).containers;
+    if (containers < services_.limits.containersMaxPerUser)
+        return {};
+    return makeError(
+        services_.log, {"createOrLookupContainerForUser", __LINE__}, ErrorCode::valueNotAllowed, nullptr, LogFlag::yes,
+        "User %u has %llu containers, and no more may be made: %s. Delete some, or start zorvaned with a larger "
+        "--containers-per-user",
+        userId, static_cast<unsigned long long>(containers), ZOR_SHOWN(identifier));
 }
 
 Result<void> ZORClientConnection::discardTransient(const ZORMetadata& record, const std::string& identifier) {

@@ -3,6 +3,7 @@
 //
 // A change is one atomic replacement of the metadata file: a stop leaves the old file or the new one.
 #include "daemon/ZORClientConnection.h"
+#include "plist/HeldBytes.h"
 #include "store/StoreServices.h"
 
 #include <cerrno>
@@ -45,6 +46,24 @@ Result<std::shared_ptr<ZORMetadata>> ZORClientConnection::knownContainer(const c
                      static_cast<long>(address.containerClass));
 }
 
+Result<void> ZORClientConnection::checkInfoShare(const ZORMetadata& record, const plist::Dictionary& info) {
+    if (ownsRoot())
+        return {};
+    const std::size_t before = record.info() ? plist::heldBytes(*record.info()) : 0;
+    const std::size_t bytes = plist::heldBytes(info);
+    if (bytes <= before)
+        return {};
+    const std::size_t held = services_.cache.heldByUser(record.uid()).infoBytes;
+    if (held + bytes - before <= services_.limits.infoBytesMaxPerUser)
+        return {};
+    const ZORError cause =
+        posixError({"setInfoValue", __LINE__}, EDQUOT,
+                   "the info values of user %u's containers take %llu bytes, and no more may be kept", record.uid(),
+                   static_cast<unsigned long long>(held));
+    return makeError(services_.log, {"setInfoValue", __LINE__}, ErrorCode::propertyListNotWritten, &cause, LogFlag::yes,
+                     "Failed to write metadata dictionary to URL %s", record.url().c_str());
+}
+
 Result<void> ZORClientConnection::setInfoValue(const plist::Value* value, const std::string* key,
                                                const ContainerAddress& address, UseLocking useLocking) {
     return services_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
@@ -62,6 +81,7 @@ Result<void> ZORClientConnection::setInfoValue(const plist::Value* value, const 
             info.set(*key, *value);
         else
             info.erase(*key);
+        TRY(checkInfoShare(*record, info));
         const ZORMetadata::Info before = record->info();
         record->setInfo(std::make_shared<const plist::Dictionary>(std::move(info)));
         if (auto written = record->writeMetadataToDiskWithError(services_.log, services_.fileManager); !written) {

@@ -52,8 +52,9 @@ Result<void> ZORClientConnection::deleteDataContainerContentForUser(std::uint32_
                                 ZOR_SHOWN(*identifier));
             return old.error();
         }
-        const auto fresh = createOrLookupContainerForUser(userId, identifier, containerClass,
-                                                          {.createIfNecessary = true, .transient = true});
+        const auto fresh =
+            createOrLookupContainerForUser(userId, identifier, containerClass,
+                                           {.createIfNecessary = true, .transient = true, .replacesAnother = true});
         if (!fresh) {
             services_.log.write(logLevelError, function, "Failed to create transient container for wipe-identifier: %s",
                                 ZOR_SHOWN(*identifier));
