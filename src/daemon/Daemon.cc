@@ -21,7 +21,12 @@ constexpr LogSize logSize{1, 102'400};
 int Daemon::run() {
     const platform::Platform& platform = composition_.platform();
     auto startUp = platform.transactions.hold();
+    const auto homeWasOpen = composition_.configuration().closeHomeDirectory();
     openLog();
+    if (!homeWasOpen)
+        composition_.log().write(logLevelError, "main", "%s", homeWasOpen.error().text().c_str());
+    else if (*homeWasOpen)
+        composition_.log().write(logLevelNotice, "main", "Closed the daemon's home directory, which others could read");
     if (!startQueues()) {
         composition_.log().write(logLevelError, "main", "Can't create dispatch queues. Exiting.");
         return -1;

@@ -3,6 +3,7 @@
 
 #include "platform/linux/Openat2.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <fcntl.h>
 
@@ -53,26 +54,21 @@ int PathResolver::status(const FileURL& url, struct stat& status) const {
     return ::fstatat(parent->directory.get(), parent->name.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0 ? 0 : errno;
 }
 
-OpenResult PathResolver::makeDirectories(platform::Disk& disk, const FileURL& url) const {
-    OpenResult whole = openDirectoryPath(url);
-    if (whole || whole.error() != ENOENT)
-        return whole;
-    const char* path = relative(url);
-    if (!path)
-        return std::unexpected(EXDEV);
-    OpenResult current = openBeneath(root_.descriptor(), ".", O_PATH | O_DIRECTORY);
-    for (const char* next = path; current && *next != '\0';) {
-        const std::string component(next, std::string_view(next).find('/') == std::string_view::npos
-                                              ? std::string_view(next).size()
-                                              : std::string_view(next).find('/'));
-        next += component.size();
-        while (*next == '/')
-            ++next;
+OpenResult makeDirectories(platform::Disk& disk, int base, std::string_view relativePath, mode_t mode) {
+    const std::string whole(relativePath.empty() ? "." : relativePath);
+    OpenResult current = openBeneath(base, whole.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
+    if (current || current.error() != ENOENT)
+        return current;
+    current = openBeneath(base, ".", O_PATH | O_DIRECTORY);
+    for (std::size_t begin = 0; current && begin < relativePath.size();) {
+        const std::size_t end = std::min(relativePath.find('/', begin), relativePath.size());
+        const std::string component(relativePath.substr(begin, end - begin));
+        begin = end + 1;
         if (component.empty())
             continue;
         OpenResult below = openBeneath(current->get(), component.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
         if (!below && below.error() == ENOENT) {
-            const int made = disk.makeDirectory(current->get(), component.c_str(), 0755);
+            const int made = disk.makeDirectory(current->get(), component.c_str(), mode);
             if (made < 0 && made != -EEXIST)
                 return std::unexpected(-made);
             below = openBeneath(current->get(), component.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);

@@ -14,6 +14,7 @@
 
 #include <expected>
 #include <string>
+#include <string_view>
 #include <sys/stat.h>
 
 namespace zor::fs {
@@ -40,16 +41,17 @@ public:
     [[nodiscard]] std::expected<ParentAndName, int> openParent(const FileURL& url) const;
     /// lstat: 0 or an errno.
     [[nodiscard]] int status(const FileURL& url, struct stat& status) const;
-    /// Opens a directory (O_PATH), making each missing one on the way, mode 0755 before the process's mask.
-    [[nodiscard]] OpenResult makeDirectories(platform::Disk& disk, const FileURL& url) const;
+    /// The path relative to the root ("." for the root itself); nullptr when it lies outside.
+    [[nodiscard]] const char* relative(const FileURL& url) const;
 
     [[nodiscard]] const platform::SystemRoot& root() const { return root_; }
 
 private:
-    /// The path relative to the root ("." for the root itself); nullptr when it lies outside.
-    [[nodiscard]] const char* relative(const FileURL& url) const;
-
     const platform::SystemRoot& root_;
 };
+
+/// Opens a directory below an open one (O_PATH; "" is that one itself), making each missing one on the way, of `mode`
+/// before the process's mask.
+[[nodiscard]] OpenResult makeDirectories(platform::Disk& disk, int base, std::string_view relativePath, mode_t mode);
 
 } // namespace zor::fs

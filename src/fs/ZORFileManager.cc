@@ -3,6 +3,7 @@
 #include "fs/ZORFileManager.h"
 
 #include "fs/AtomicFile.h"
+#include "fs/FreshDirectory.h"
 #include "platform/linux/Openat2.h"
 
 #include <cerrno>
@@ -16,85 +17,191 @@ using platform::FileDescriptor;
 using platform::openBeneath;
 
 namespace {
+
 constexpr int namesTriedMax = 16;
+constexpr mode_t closedMode = 0700;
+constexpr mode_t permissionBits = 07777;
+
+/// lstat: 0 or an errno.
+int statusBelow(int base, const std::string& relativePath, struct stat& status) {
+    const std::size_t slash = relativePath.rfind('/');
+    const std::string above = slash == relativePath.npos ? "." : relativePath.substr(0, slash);
+    const auto parent = openBeneath(base, above.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
+    if (!parent)
+        return parent.error();
+    const char* const name = relativePath.c_str() + (slash == relativePath.npos ? 0 : slash + 1);
+    return ::fstatat(parent->get(), name, &status, AT_SYMLINK_NOFOLLOW) == 0 ? 0 : errno;
 }
+
+/// The call in messages.
+const char* makingVerb(Intermediates intermediates) {
+    return intermediates == Intermediates::yes ? "dirchain" : "mkdir";
+}
+
+} // namespace
 
 Result<void> ZORFileManager::createDirectoryAtURL(const FileURL& url, Intermediates intermediates,
                                                   const DirectoryAttributes& attributes) {
-    struct stat status{};
-    const int failure = resolver_.status(url, status);
-    if (failure != 0 && failure != ENOENT)
-        return posixError(ZOR_HERE, failure, "Failed to determine if %s exists: %s", url.c_str(), errorText(failure));
-    if (failure == ENOENT)
-        return makeNewDirectory(url, intermediates, attributes);
-    if (!S_ISDIR(status.st_mode)) {
-        // Changing the attributes of whatever stands there instead, perhaps through a link, would be acting on
-        // another's file.
-        const int number = S_ISLNK(status.st_mode) ? ELOOP : ENOTDIR;
-        return posixError(ZOR_HERE, number, "%s of %s failed: %s",
-                          intermediates == Intermediates::yes ? "dirchain" : "mkdir", url.c_str(), errorText(number));
-    }
-    const bool ownerFits =
-        attributes.owner == ownerUnchanged || (status.st_uid == attributes.owner && status.st_gid == attributes.owner);
-    if (attributes.protectionClass == protectionClassUnchanged && ownerFits &&
-        (status.st_mode & 07777) == attributes.mode)
-        return {};
-    auto parent = resolver_.openParent(url);
-    if (!parent)
-        return posixError(ZOR_HERE, parent.error(), "Failed to determine if %s exists: %s", url.c_str(),
-                          errorText(parent.error()));
-    return applyAttributes(parent->directory.get(), parent->name, url.path(), attributes);
+    TRY(openOrCreateDirectoryAtURL(url, intermediates, attributes));
+    return {};
 }
 
-Result<void> ZORFileManager::makeNewDirectory(const FileURL& url, Intermediates intermediates,
-                                              const DirectoryAttributes& attributes) {
-    const char* const verb = intermediates == Intermediates::yes ? "dirchain" : "mkdir";
+Result<FileDescriptor> ZORFileManager::openOrCreateDirectoryAtURL(const FileURL& url, Intermediates intermediates,
+                                                                  const DirectoryAttributes& attributes) {
+    const char* const path = resolver_.relative(url);
+    if (!path)
+        return posixError(ZOR_HERE, EXDEV, "Failed to determine if %s exists: %s", url.c_str(), errorText(EXDEV));
+    return openOrCreate(resolver_.root().descriptor(), path, url, intermediates, attributes);
+}
+
+Result<FileDescriptor> ZORFileManager::openOrCreateDirectoryBelow(int base, const FileURL& baseUrl,
+                                                                  const std::string& relativePath,
+                                                                  Intermediates intermediates,
+                                                                  const DirectoryAttributes& attributes) {
+    return openOrCreate(base, relativePath, baseUrl.appendingDirectory(relativePath), intermediates, attributes);
+}
+
+Result<FileDescriptor> ZORFileManager::openOrCreate(int base, const std::string& relativePath, const FileURL& url,
+                                                    Intermediates intermediates,
+                                                    const DirectoryAttributes& attributes) {
+    // A class can be set on a descriptor only that was opened for reading.
+    const int access = attributes.protectionClass == protectionClassUnchanged ? O_PATH : O_RDONLY;
+    auto existing = openBeneath(base, relativePath.c_str(), access | O_DIRECTORY | O_NOFOLLOW);
+    if (!existing && existing.error() == ENOENT)
+        return makeNewDirectory(base, relativePath, url, intermediates, attributes);
+    if (!existing) {
+        constexpr Here here{"createDirectoryAtURL", __LINE__};
+        struct stat status{};
+        const bool misshapen = existing.error() == ELOOP || existing.error() == ENOTDIR;
+        const int failure = misshapen ? statusBelow(base, relativePath, status) : existing.error();
+        if (failure != 0)
+            return posixError(here, failure, "Failed to determine if %s exists: %s", url.c_str(), errorText(failure));
+        // It is there: a link, or a file.
+        const int number = S_ISLNK(status.st_mode) ? ELOOP : ENOTDIR;
+        return posixError(here, number, "%s of %s failed: %s", makingVerb(intermediates), url.c_str(),
+                          errorText(number));
+    }
+    TRY(mendDirectory(existing->get(), url, attributes));
+    return std::move(*existing);
+}
+
+Result<void> ZORFileManager::judgeOwner(int directory, const FileURL& url, std::uint32_t owner) const {
+    struct stat status{};
+    if (::fstat(directory, &status) != 0)
+        return posixError(ZOR_HERE, errno, "Failed to determine if %s exists: %s", url.c_str(), errorText(errno));
+    if (status.st_uid != ownerToBe(owner))
+        return posixError(ZOR_HERE, EPERM,
+                          "%s belongs to user %u instead of user %u, so it stays as it is; move it away, and it is "
+                          "made anew",
+                          url.c_str(), status.st_uid, ownerToBe(owner));
+    return {};
+}
+
+Result<FileDescriptor> ZORFileManager::openDirectoryOf(std::uint32_t owner, const FileURL& url) const {
+    auto opened = resolver_.openDirectory(url);
+    if (!opened)
+        return posixError(ZOR_HERE, opened.error(), "open of %s failed: %s", url.c_str(), errorText(opened.error()));
+    TRY(judgeOwner(opened->get(), url, owner));
+    return std::move(*opened);
+}
+
+uid_t ZORFileManager::ownerToBe(std::uint32_t owner) const {
+    return owner == ownerUnchanged || daemon_ != 0 ? daemon_ : owner;
+}
+
+Result<void> ZORFileManager::mendDirectory(int directory, const FileURL& url, const DirectoryAttributes& attributes) {
+    struct stat status{};
+    if (attributes.otherOwner != ownerUnchanged && ::fstat(directory, &status) == 0 &&
+        status.st_uid == attributes.otherOwner)
+        return {};
+    TRY(judgeOwner(directory, url, attributes.owner));
+    if (attributes.protectionClass != protectionClassUnchanged)
+        TRY(setDirectoryClass(directory, url.path(), attributes.protectionClass));
+    struct stat parent{};
+    if (::fstat(directory, &status) != 0)
+        return posixError(ZOR_HERE, errno, "opendir of %s failed: %s", url.c_str(), errorText(errno));
+    const bool groupFits = attributes.owner == ownerUnchanged || status.st_gid == attributes.owner;
+    const mode_t mode = status.st_mode & permissionBits;
+    if (groupFits && mode == attributes.mode)
+        return {};
+    // Who can write the parent can have given its name to another directory of this owner's, one that is closed for a
+    // reason. Only who may write the directory itself can move it to another parent meanwhile.
+    if (::fstatat(directory, "..", &parent, 0) != 0)
+        return posixError(ZOR_HERE, errno, "opendir of %s failed: %s", url.c_str(), errorText(errno));
+    const bool othersCanName = (parent.st_mode & (S_IWGRP | S_IWOTH)) != 0 ||
+                               (parent.st_uid != status.st_uid && parent.st_uid != daemon_ && parent.st_uid != 0);
+    if (!groupFits && !othersCanName)
+        disk_.changeOwner(directory, attributes.owner, attributes.owner);
+    const mode_t mended = othersCanName ? mode & attributes.mode : attributes.mode;
+    if (mended != mode)
+        disk_.changeMode(directory, mended);
+    return {};
+}
+
+Result<FileDescriptor> ZORFileManager::makeNewDirectory(int base, std::string_view relativePath, const FileURL& url,
+                                                        Intermediates intermediates,
+                                                        const DirectoryAttributes& attributes) {
     const FileURL parentUrl = url.deletingLastPathComponent();
-    const auto parent = intermediates == Intermediates::yes ? resolver_.makeDirectories(disk_, parentUrl)
-                                                            : resolver_.openDirectoryPath(parentUrl);
+    const std::size_t slash = relativePath.rfind('/');
+    const std::string above(slash == relativePath.npos ? "." : relativePath.substr(0, slash));
+    const auto parent = intermediates == Intermediates::yes
+                            ? fs::makeDirectories(disk_, base, above, attributes.intermediateMode)
+                            : openBeneath(base, above.c_str(), O_PATH | O_DIRECTORY);
     const std::string finalName(url.lastPathComponent());
     std::string name;
     int made = parent ? -EEXIST : -parent.error();
     for (int tried = 0; parent && made == -EEXIST && tried < namesTriedMax; ++tried) {
         name = uniqueName(finalName + ".");
-        made = disk_.makeDirectory(parent->get(), name.c_str(), attributes.mode);
+        made = disk_.makeDirectory(parent->get(), name.c_str(), closedMode);
     }
     const std::string temporaryPath = parent ? parentUrl.appendingDirectory(name).path() : url.path();
     if (made == -EEXIST)
         return posixError(ZOR_HERE, EEXIST, "Failed to create temp dir at path %s : %s", temporaryPath.c_str(),
                           errorText(EEXIST));
     if (made < 0)
-        return posixError(ZOR_HERE, -made, "%s of %s failed: %s", verb, temporaryPath.c_str(), errorText(-made));
-    Result<void> placed = applyAttributes(parent->get(), name, temporaryPath, attributes);
+        return posixError(ZOR_HERE, -made, "%s of %s failed: %s", makingVerb(intermediates), temporaryPath.c_str(),
+                          errorText(-made));
+    auto directory = openBeneath(parent->get(), name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
+    if (!directory)
+        return posixError(ZOR_HERE, directory.error(), "opendir of %s failed: %s", temporaryPath.c_str(),
+                          errorText(directory.error()));
+    // Whoever can write the parent can have put another directory there.
+    if (!fs::isFreshDirectory(directory->get()))
+        return posixError(ZOR_HERE, EPERM, "%s was exchanged while it was made; it stays as it is",
+                          temporaryPath.c_str());
+    Result<void> placed = giveNewDirectory(directory->get(), temporaryPath, attributes);
     if (placed)
         if (const int renamed = disk_.rename(parent->get(), name.c_str(), parent->get(), finalName.c_str(), 0);
             renamed < 0)
             placed = posixError(ZOR_HERE, -renamed, "failed to rename from %s to %s : %s", temporaryPath.c_str(),
                                 url.c_str(), errorText(-renamed));
-    if (!placed)
+    if (!placed) {
         (void)disk_.removeDirectory(parent->get(), name.c_str());
-    return placed;
+        return std::move(placed).error();
+    }
+    return std::move(*directory);
 }
 
-Result<void> ZORFileManager::applyAttributes(int parent, const std::string& name, const std::string& path,
-                                             const DirectoryAttributes& attributes) {
-    const auto directory = openBeneath(parent, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
-    if (!directory)
-        return posixError(ZOR_HERE, directory.error(), "opendir of %s failed: %s", path.c_str(),
-                          errorText(directory.error()));
-    if (attributes.protectionClass != protectionClassUnchanged) {
-        const int failure = setClassAtCreation(directory->get(), attributes.protectionClass);
-        if (failure != 0)
-            return posixError(ZOR_HERE, failure, "Failed to setclass(%d) on directory %s: %s",
-                              attributes.protectionClass, path.c_str(), errorText(failure));
+Result<void> ZORFileManager::giveNewDirectory(int directory, const std::string& path,
+                                              const DirectoryAttributes& attributes) {
+    if (attributes.protectionClass != protectionClassUnchanged)
+        TRY(setDirectoryClass(directory, path, attributes.protectionClass));
+    // One that could not be given would be another's for ever once it had its name.
+    int status = disk_.changeMode(directory, attributes.mode);
+    const char* verb = "chmod";
+    if (status == 0 && attributes.owner != ownerUnchanged) {
+        status = disk_.changeOwner(directory, attributes.owner, attributes.owner);
+        verb = "chown";
     }
-    struct stat status{};
-    if (::fstat(directory->get(), &status) != 0)
-        return posixError(ZOR_HERE, errno, "opendir of %s failed: %s", path.c_str(), errorText(errno));
-    if ((status.st_mode & 07777) != attributes.mode)
-        disk_.changeMode(directory->get(), attributes.mode);
-    if (attributes.owner != ownerUnchanged && (status.st_uid != attributes.owner || status.st_gid != attributes.owner))
-        disk_.changeOwner(directory->get(), attributes.owner, attributes.owner);
+    if (status < 0)
+        return posixError(ZOR_HERE, -status, "%s of %s failed: %s", verb, path.c_str(), errorText(-status));
+    return {};
+}
+
+Result<void> ZORFileManager::setDirectoryClass(int directory, const std::string& path, int protectionClass) {
+    if (const int failure = setClassAtCreation(directory, protectionClass))
+        return posixError(ZOR_HERE, failure, "Failed to setclass(%d) on directory %s: %s", protectionClass,
+                          path.c_str(), errorText(failure));
     return {};
 }
 
@@ -111,21 +218,18 @@ int ZORFileManager::setClassAtCreation(int directory, int protectionClass) {
     return 0;
 }
 
-Result<FileURL> ZORFileManager::createTemporaryDirectoryInDirectoryURL(const FileURL& directory, std::uint32_t owner) {
+Result<FileURL> ZORFileManager::createTemporaryDirectoryInDirectoryURL(const FileURL& directory) {
     const auto parent = resolver_.openDirectoryPath(directory);
     std::string name;
     int made = parent ? -EEXIST : -parent.error();
     for (int tried = 0; parent && made == -EEXIST && tried < namesTriedMax; ++tried) {
         name = uniqueName("temp.");
-        made = disk_.makeDirectory(parent->get(), name.c_str(), 0700);
+        made = disk_.makeDirectory(parent->get(), name.c_str(), closedMode);
     }
     FileURL url = directory.appendingDirectory(name);
     if (made < 0)
         return posixError(ZOR_HERE, -made, "Failed to create temp dir at path %s : %s",
                           directory.appendingDirectory("temp.XXXXXX").c_str(), errorText(-made));
-    if (owner != ownerUnchanged)
-        if (const auto own = openBeneath(parent->get(), name.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW))
-            disk_.changeOwner(own->get(), owner, owner);
     return url;
 }
 

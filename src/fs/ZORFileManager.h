@@ -24,6 +24,7 @@
 #include <functional>
 #include <string>
 #include <string_view>
+#include <unistd.h>
 #include <vector>
 
 namespace zor {
@@ -36,30 +37,48 @@ enum class Intermediates { no, yes };
 
 /// A protection-class argument that leaves the class alone.
 inline constexpr int protectionClassUnchanged = -1;
-/// An owner argument that leaves the ownership as it comes.
+/// An owner argument that leaves the ownership as it comes: the daemon's.
 inline constexpr std::uint32_t ownerUnchanged = 0;
 
 struct DirectoryAttributes {
     mode_t mode = 0755;
     std::uint32_t owner = ownerUnchanged; // user id and group id alike
     int protectionClass = protectionClassUnchanged;
+    /// Of missing levels that are made on the way.
+    mode_t intermediateMode = 0755;
+    /// A second user to whom an existing directory may belong; it is left to that user as it is.
+    std::uint32_t otherOwner = ownerUnchanged;
 };
 
 class ZORFileManager {
 public:
     ZORFileManager(const Log& log, const platform::SystemRoot& root, platform::Disk& disk,
                    platform::FileProtectionClass& protection)
-        : log_(log), disk_(disk), protection_(protection), resolver_(root) {}
+        : log_(log), disk_(disk), protection_(protection), resolver_(root), daemon_(::geteuid()) {}
     ZORFileManager(const ZORFileManager&) = delete;
     ZORFileManager& operator=(const ZORFileManager&) = delete;
 
-    // Creation. An existing directory gets its attributes again and counts as created; a new one comes into existence
-    // under its final name only with them.
+    // Creation. A new directory comes into existence under its final name only with its attributes. An existing one
+    // that belongs to the wanted owner gets them again and counts as created, but nobody is let in by that where others
+    // could have put it there: they can write its parent. Anybody else's stays as it is and is EPERM, for its name
+    // alone makes no directory the wanted one.
     Result<void> createDirectoryAtURL(const FileURL& url, Intermediates intermediates,
                                       const DirectoryAttributes& attributes);
-    /// A new directory "temp." and six characters, mode 0700.
-    Result<FileURL> createTemporaryDirectoryInDirectoryURL(const FileURL& directory,
-                                                           std::uint32_t owner = ownerUnchanged);
+    /// The same, and the directory that was judged or made: for naming items in it.
+    Result<platform::FileDescriptor> openOrCreateDirectoryAtURL(const FileURL& url, Intermediates intermediates,
+                                                                const DirectoryAttributes& attributes);
+    /// The same below a directory that is open, whose name `baseUrl` is in messages.
+    Result<platform::FileDescriptor> openOrCreateDirectoryBelow(int base, const FileURL& baseUrl,
+                                                                const std::string& relativePath,
+                                                                Intermediates intermediates,
+                                                                const DirectoryAttributes& attributes);
+    /// Whether an open directory belongs to the user (the daemon, for ownerUnchanged); EPERM else. A daemon that is not
+    /// root gives nothing away: there it has to be the daemon's own.
+    Result<void> judgeOwner(int directory, const FileURL& url, std::uint32_t owner) const;
+    /// Opens a directory for reading its entries and acting on it, and judges its owner.
+    Result<platform::FileDescriptor> openDirectoryOf(std::uint32_t owner, const FileURL& url) const;
+    /// A new directory "temp." and six characters, mode 0700 and the daemon's own.
+    Result<FileURL> createTemporaryDirectoryInDirectoryURL(const FileURL& directory);
 
     // Removal, copy, move.
     /// Removes a tree; what is missing is not missed. An item that cannot be removed lets the rest go and is the error.
@@ -121,21 +140,30 @@ private:
     enum class MissingSource { fails, isFine };
     Result<void> _copyItemAtURL(const FileURL& source, const FileURL& destination, MissingSource missing);
     Result<void> _moveItemAtURL(const FileURL& source, const FileURL& destination, MissingSource missing);
-    Result<void> moveAcrossFileSystems(const FileURL& source, const FileURL& destination);
+    Result<void> moveAcrossFileSystems(int fromDirectory, const FileURL& source, int toDirectory,
+                                       const FileURL& destination);
     /// 0 or a negative errno: the source then has its name still, or is a hidden leftover.
-    int removeMovedSource(const FileURL& source, const FileURL& destination);
+    int removeMovedSource(int fromDirectory, const FileURL& source, int toDirectory);
     Result<bool> sourceIsMissing(const FileURL& source);
     /// Copies beside the destination and renames, so that a partial copy never has the final name.
-    Result<void> copyTree(const FileURL& source, const FileURL& destination);
+    Result<void> copyTree(int fromDirectory, const FileURL& source, int toDirectory, const FileURL& destination);
 
     std::vector<FileURL> itemsNamed(const FileURL& directory, bool (*belongs)(std::string_view name)) const;
 
     Result<void> setClassOf(int fd, const std::string& path, int protectionClass,
                             const std::function<bool(int)>& predicate);
-    Result<void> makeNewDirectory(const FileURL& url, Intermediates intermediates,
-                                  const DirectoryAttributes& attributes);
-    Result<void> applyAttributes(int parent, const std::string& name, const std::string& path,
-                                 const DirectoryAttributes& attributes);
+    Result<platform::FileDescriptor> openOrCreate(int base, const std::string& relativePath, const FileURL& url,
+                                                  Intermediates intermediates, const DirectoryAttributes& attributes);
+    Result<platform::FileDescriptor> makeNewDirectory(int base, std::string_view relativePath, const FileURL& url,
+                                                      Intermediates intermediates,
+                                                      const DirectoryAttributes& attributes);
+    /// To a directory that this process has just made and that nobody has exchanged.
+    Result<void> giveNewDirectory(int directory, const std::string& path, const DirectoryAttributes& attributes);
+    /// To one that was there: judges it first.
+    Result<void> mendDirectory(int directory, const FileURL& url, const DirectoryAttributes& attributes);
+    Result<void> setDirectoryClass(int directory, const std::string& path, int protectionClass);
+    /// Who a directory for `owner` belongs to in the end.
+    [[nodiscard]] uid_t ownerToBe(std::uint32_t owner) const;
     /// `directory` is the entry's own descriptor where it is a directory that is open, else negative.
     void standardizeEntry(int parent, const char* name, int directory, const std::string& path, uid_t uid, gid_t gid,
                           fs::NamesMet& namesMet);
@@ -144,6 +172,7 @@ private:
     platform::Disk& disk_;
     platform::FileProtectionClass& protection_;
     fs::PathResolver resolver_;
+    const uid_t daemon_;
     std::atomic<bool> saidClassesUnsupported_{false};
 };
 

@@ -117,29 +117,31 @@ Result<bool> ZORFileManager::sourceIsMissing(const FileURL& source) {
 Result<void> ZORFileManager::_copyItemAtURL(const FileURL& source, const FileURL& destination, MissingSource missing) {
     if (missing == MissingSource::isFine && TRY(sourceIsMissing(source)))
         return {};
-    return copyTree(source, destination);
-}
-
-Result<void> ZORFileManager::copyTree(const FileURL& source, const FileURL& destination) {
     const auto from = resolver_.openParent(source);
     const auto to = resolver_.openParent(destination);
-    int status = 0;
     if (!from || !to) {
-        status = -(from ? to.error() : from.error());
-    } else {
-        const std::string hidden = fs::uniqueName(fs::copyPrefix);
-        const int directory = to->directory.get();
-        status = fs::copyTree(disk_, from->directory.get(), from->name.c_str(), directory, hidden.c_str());
-        // Nothing of a copy may be missing once it has its name, whatever the power does.
-        if (status == 0) {
-            const auto copied = platform::openBeneath(directory, ".", O_RDONLY | O_DIRECTORY);
-            status = copied ? disk_.syncFileSystem(copied->get()) : -copied.error();
-        }
-        if (status == 0)
-            status = disk_.rename(directory, hidden.c_str(), directory, to->name.c_str(), 0);
-        if (status < 0)
-            fs::removeTree(disk_, directory, hidden.c_str());
+        const int number = from ? to.error() : from.error();
+        return posixError({"copyTree", __LINE__}, number, "clonetree of %s to %s failed: %s", source.c_str(),
+                          destination.c_str(), errorText(number));
     }
+    return copyTree(from->directory.get(), source, to->directory.get(), destination);
+}
+
+Result<void> ZORFileManager::copyTree(int fromDirectory, const FileURL& source, int toDirectory,
+                                      const FileURL& destination) {
+    const std::string hidden = fs::uniqueName(fs::copyPrefix);
+    int status = fs::copyTree(disk_, fromDirectory, std::string(source.lastPathComponent()).c_str(), toDirectory,
+                              hidden.c_str());
+    // Nothing of a copy may be missing once it has its name, whatever the power does.
+    if (status == 0) {
+        const auto copied = platform::openBeneath(toDirectory, ".", O_RDONLY | O_DIRECTORY);
+        status = copied ? disk_.syncFileSystem(copied->get()) : -copied.error();
+    }
+    if (status == 0)
+        status = disk_.rename(toDirectory, hidden.c_str(), toDirectory,
+                              std::string(destination.lastPathComponent()).c_str(), 0);
+    if (status < 0)
+        fs::removeTree(disk_, toDirectory, hidden.c_str());
     if (status < 0)
         return posixError(ZOR_HERE, -status, "clonetree of %s to %s failed: %s", source.c_str(), destination.c_str(),
                           errorText(-status));
@@ -163,7 +165,7 @@ Result<ZORFileManager::Moved> ZORFileManager::moveItem(int fromDirectory, const 
     const int status = disk_.rename(fromDirectory, std::string(source.lastPathComponent()).c_str(), toDirectory,
                                     std::string(destination.lastPathComponent()).c_str(), 0);
     if (status == -EXDEV) {
-        TRY(moveAcrossFileSystems(source, destination));
+        TRY(moveAcrossFileSystems(fromDirectory, source, toDirectory, destination));
         return Moved::byCopy;
     }
     if (status < 0)
@@ -172,31 +174,29 @@ Result<ZORFileManager::Moved> ZORFileManager::moveItem(int fromDirectory, const 
     return Moved::byName;
 }
 
-Result<void> ZORFileManager::moveAcrossFileSystems(const FileURL& source, const FileURL& destination) {
-    TRY(copyTree(source, destination));
-    const int removed = removeMovedSource(source, destination);
+Result<void> ZORFileManager::moveAcrossFileSystems(int fromDirectory, const FileURL& source, int toDirectory,
+                                                   const FileURL& destination) {
+    TRY(copyTree(fromDirectory, source, toDirectory, destination));
+    const int removed = removeMovedSource(fromDirectory, source, toDirectory);
     if (removed < 0)
         log_.write(logLevelError, __func__, "Failed to remove source %s : %s", source.c_str(), errorText(-removed));
     return {};
 }
 
-int ZORFileManager::removeMovedSource(const FileURL& source, const FileURL& destination) {
-    const auto syncParent = [this](const FileURL& url) {
-        const auto directory = resolver_.openDirectory(url.deletingLastPathComponent());
-        return directory ? disk_.sync(directory->get()) : -directory.error();
+int ZORFileManager::removeMovedSource(int fromDirectory, const FileURL& source, int toDirectory) {
+    const auto synced = [this](int directory) {
+        const auto listing = platform::openBeneath(directory, ".", O_RDONLY | O_DIRECTORY); // it may be O_PATH
+        return listing ? disk_.sync(listing->get()) : -listing.error();
     };
-    const auto from = resolver_.openParent(source);
-    if (!from)
-        return -from.error();
-    const int directory = from->directory.get();
     const std::string hidden = fs::uniqueName(fs::copyPrefix);
     // The source leaves its name in one step, when the copy cannot lose its own any more; only then it is taken apart.
-    int status = syncParent(destination);
+    int status = synced(toDirectory);
     if (status == 0)
-        status = disk_.rename(directory, from->name.c_str(), directory, hidden.c_str(), 0);
+        status = disk_.rename(fromDirectory, std::string(source.lastPathComponent()).c_str(), fromDirectory,
+                              hidden.c_str(), 0);
     if (status == 0)
-        status = syncParent(source);
-    return status < 0 ? status : fs::removeTree(disk_, directory, hidden.c_str());
+        status = synced(fromDirectory);
+    return status < 0 ? status : fs::removeTree(disk_, fromDirectory, hidden.c_str());
 }
 
 Result<void> ZORFileManager::_traverseDirectory(const FileURL& url,

@@ -170,7 +170,20 @@ Result<void> ZORContainerMigrator::moveFormerBundle(const FileURL& container, co
     // One that lies in both places was copied from another file system, and the stop came before its source went.
     if (services_.fileManager.itemExistsAtURL(target))
         return services_.sharedClientConnection->_moveItemAtURLToDeathRow(container, StartDeletionThread::no);
-    return services_.fileManager.moveItemAtURL(container, target);
+    ZORFileManager& fileManager = services_.fileManager;
+    const FileURL place = target.deletingLastPathComponent();
+    const auto from = fileManager.resolver().openParent(container);
+    if (!from)
+        return posixError({migrationFunction, __LINE__}, from.error(), "rename of %s to %s failed: %s",
+                          container.c_str(), target.c_str(), errorText(from.error()));
+    // The old owner's until the end of a migration that was cut short.
+    auto to = fileManager.openDirectoryOf(firstMobileUserId, place);
+    if (!to)
+        to = fileManager.openDirectoryOf(bundleOwnerUserId, place);
+    if (!to)
+        return std::move(to).error();
+    TRY(fileManager.moveItem(from->directory.get(), container, to->get(), target));
+    return {};
 }
 
 void ZORContainerMigrator::adoptBundlesOfClass(ContainerClass containerClass, Count& count) {
@@ -293,7 +306,11 @@ Result<bool> ZORContainerMigrator::migrateWellknown(const std::shared_ptr<ZORMet
                   ZOR_SHOWN(identifier), removed.error().domainName(), code(removed.error()));
         return std::move(removed).error();
     }
-    auto moved = services_.fileManager.moveItemAtURL(former, target);
+    auto moved = [&]() -> Result<void> {
+        const auto directory = TRY(services_.fileManager.openDirectoryOf(ownerUnchanged, classDirectory));
+        TRY(services_.fileManager.moveItem(directory.get(), former, directory.get(), target));
+        return {};
+    }();
     if (!moved) {
         log.write(logLevelError, whitelistFunction,
                   "%s: Failed to move system container %s from %s to whitelisted location %s: (error= %s: %lld)",

@@ -18,6 +18,8 @@ class StorePlaces {
 public:
     explicit StorePlaces(const fs::PathResolver& resolver);
 
+    /// The home of the daemon's own directories.
+    [[nodiscard]] const FileURL& homeDirectory() const { return homeDirectory_; }
     [[nodiscard]] const FileURL& brevadHomeDirectory() const { return brevadHomeDirectory_; }
     [[nodiscard]] const FileURL& sharedContainersDirectory() const { return sharedContainersDirectory_; }
     /// DIR/tmp; the system's.

@@ -2,7 +2,14 @@
 #include "store/ZORGlobalConfiguration.h"
 
 #include "daemon/base/UserIdentity.h"
+#include "ipc/ContainerClasses.h"
 #include "store/Names.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <sys/stat.h>
+#include <unistd.h>
+#include <vector>
 
 namespace zor {
 
@@ -10,10 +17,13 @@ using platform::RecursiveMutexLock;
 
 namespace {
 
-/// Files of the daemon itself stay readable while the device is locked.
-constexpr DirectoryAttributes ownDirectory{.mode = 0755, .protectionClass = 4};
+constexpr mode_t closedMode = 0700;
+/// Files of the daemon itself stay readable while the device is locked. The home above them may be missing.
+constexpr DirectoryAttributes ownDirectory{.mode = 0755, .protectionClass = 4, .intermediateMode = closedMode};
 constexpr DirectoryAttributes plainDirectory{.mode = 0755};
 constexpr DirectoryAttributes bundleOwnedDirectory{.mode = 0755, .owner = bundleOwnerUserId};
+/// The migration of an older system's bundles gives the installer the whole place.
+constexpr DirectoryAttributes bundlesDirectory{.mode = 0755, .otherOwner = bundleOwnerUserId};
 
 } // namespace
 
@@ -102,7 +112,7 @@ FileURL ZORGlobalConfiguration::bundleDirectory() {
     const RecursiveMutexLock held(lock_);
     sharedContainersDirectory();
     FileURL url = places_.bundleDirectory();
-    makeDirectory(url, plainDirectory, __func__, "bundle dir");
+    makeDirectory(url, bundlesDirectory, __func__, "bundle dir");
     return url;
 }
 
@@ -117,14 +127,74 @@ FileURL ZORGlobalConfiguration::transientBundleDirectory() {
     return url;
 }
 
+Result<bool> ZORGlobalConfiguration::closeHomeDirectory() {
+    const FileURL& home = places_.homeDirectory();
+    const fs::PathResolver& resolver = fileManager_.resolver();
+    const auto opened = resolver.openDirectoryPath(home);
+    if (!opened && opened.error() == ENOENT) {
+        TRY(fileManager_.createDirectoryAtURL(home, Intermediates::yes, {.mode = closedMode}));
+        return false;
+    }
+    struct stat status{};
+    int failure = !opened ? opened.error() : ::fstat(opened->get(), &status) != 0 ? errno : 0;
+    const bool isOpen = failure == 0 && (status.st_mode & (S_IRWXG | S_IRWXO)) != 0;
+    if (failure == 0 && isOpen && status.st_uid == ::geteuid())
+        failure = -fileManager_.disk().changeMode(opened->get(), closedMode);
+    else if (isOpen)
+        failure = EPERM;
+    if (failure != 0)
+        return posixError(ZOR_HERE, failure, "%s cannot be closed to others, who may read what is deleted: %s",
+                          home.c_str(), errorText(failure));
+    return isOpen;
+}
+
+std::uint32_t ZORGlobalConfiguration::ownerOfClassDirectory(ContainerClass containerClass, std::uint32_t userId) {
+    if (isBundleClass(containerClass))
+        return bundleOwnerUserId;
+    return isSystemClass(containerClass) ? ownerUnchanged : userId;
+}
+
+std::optional<std::uint32_t> ZORGlobalConfiguration::ownerOfClassDirectory(const FileURL& directory) {
+    const auto isOf = [&](ContainerClass containerClass, const std::optional<FileURL>& home) {
+        for (const bool transient : {false, true}) {
+            const auto base = places_.baseOfClass(containerClass, transient, home);
+            if (base && base->appendingDirectory(className(containerClass)) == directory)
+                return true;
+        }
+        return false;
+    };
+    std::vector<ContainerClass> ofUsers;
+    for (std::uint64_t number = 1; ipc::isContainerClass(number); ++number) {
+        const auto containerClass = static_cast<ContainerClass>(number);
+        if (isPerUserClass(containerClass))
+            ofUsers.push_back(containerClass);
+        else if (isOf(containerClass, std::nullopt))
+            return ownerOfClassDirectory(containerClass, systemOwnerUserId);
+    }
+    for (std::uint32_t userId = firstMobileUserId; userId <= lastMobileUserId; ++userId) {
+        ZORPerUserConfiguration* const user = getPerUserConfigurationForUserId(userId);
+        const auto home = user ? user->userHomeDirectory() : std::nullopt;
+        if (home &&
+            std::ranges::any_of(ofUsers, [&](ContainerClass containerClass) { return isOf(containerClass, home); }))
+            return userId;
+    }
+    return std::nullopt;
+}
+
 std::optional<FileURL> ZORGlobalConfiguration::containerDirectoryURLForUser(std::uint32_t userId,
                                                                             ContainerClass containerClass,
                                                                             bool transient) {
+    auto directory = openClassDirectory(userId, containerClass, transient);
+    return directory ? std::optional(std::move(directory->url)) : std::nullopt;
+}
+
+std::optional<UsableDirectory>
+ZORGlobalConfiguration::openClassDirectory(std::uint32_t userId, ContainerClass containerClass, bool transient) {
     const RecursiveMutexLock held(lock_);
     const bool bundle = isBundleClass(containerClass);
     if (!bundle && !isSystemClass(containerClass)) {
         ZORPerUserConfiguration* user = getPerUserConfigurationForUserId(userId);
-        return user ? user->containerDirectoryURLForContentClass(containerClass, transient) : std::nullopt;
+        return user ? user->openClassDirectory(containerClass, transient) : std::nullopt;
     }
     FileURL base;
     if (!transient)
@@ -132,8 +202,12 @@ std::optional<FileURL> ZORGlobalConfiguration::containerDirectoryURLForUser(std:
     else
         base = bundle ? transientBundleDirectory() : transientDirectory();
     FileURL url = base.appendingDirectory(className(containerClass));
-    makeDirectory(url, bundle ? bundleOwnedDirectory : plainDirectory, __func__, "container dir");
-    return url;
+    auto opened = fileManager_.openOrCreateDirectoryAtURL(url, Intermediates::yes,
+                                                          bundle ? bundleOwnedDirectory : plainDirectory);
+    if (!opened)
+        log_.write(logLevelError, "containerDirectoryURLForUser", "Failed to create container dir at \"%s\": %s",
+                   url.c_str(), opened.error().text().c_str());
+    return UsableDirectory{.url = std::move(url), .opened = std::move(opened)};
 }
 
 std::optional<FileURL> ZORGlobalConfiguration::placeOfClass(std::uint32_t userId, ContainerClass containerClass,

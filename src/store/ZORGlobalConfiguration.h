@@ -49,9 +49,21 @@ public:
     /// DIR/tmp; the system's, not made here.
     [[nodiscard]] FileURL temporaryDirectory() const { return places_.temporaryDirectory(); }
 
+    /// Closes the home of the daemon's own directories to everybody else, where it is the daemon's, and makes it closed
+    /// where it is missing: what is staged or deleted is private. Whether it was open.
+    Result<bool> closeHomeDirectory();
+
     /// The class directory, made if missing; absent only for a class or user that has none.
     std::optional<FileURL> containerDirectoryURLForUser(std::uint32_t userId, ContainerClass containerClass,
                                                         bool transient);
+    /// The same directory, open, for moving containers into it: with what it failed for, its URL is of use for messages
+    /// alone.
+    std::optional<UsableDirectory> openClassDirectory(std::uint32_t userId, ContainerClass containerClass,
+                                                      bool transient);
+    /// Who such a directory belongs to; ownerUnchanged: the daemon.
+    [[nodiscard]] static std::uint32_t ownerOfClassDirectory(ContainerClass containerClass, std::uint32_t userId);
+    /// The same by its place; absent where no class has its directory.
+    [[nodiscard]] std::optional<std::uint32_t> ownerOfClassDirectory(const FileURL& directory);
 
     /// Where it is, or would be; not made here.
     std::optional<FileURL> placeOfClass(std::uint32_t userId, ContainerClass containerClass, bool transient);

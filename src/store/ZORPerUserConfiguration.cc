@@ -61,46 +61,73 @@ bool ZORPerUserConfiguration::existsUserBaseDirectory() {
     return home && fileManager_.itemExistsAtURL(*home);
 }
 
-void ZORPerUserConfiguration::makeDirectory(const FileURL& url, const char* function, const char* what) {
-    const auto made = fileManager_.createDirectoryAtURL(url, Intermediates::yes, {.mode = 0755, .owner = userId_});
-    if (!made)
+UsableDirectory ZORPerUserConfiguration::judged(FileURL url, Result<platform::FileDescriptor> opened,
+                                                const char* function, const char* what) {
+    if (!opened)
         log_.write(logLevelError, function, "Failed to create %s dir at \"%s\": %s", what, url.c_str(),
-                   made.error().text().c_str());
+                   opened.error().text().c_str());
+    return {.url = std::move(url), .opened = std::move(opened)};
 }
 
-std::optional<FileURL> ZORPerUserConfiguration::userBaseDirectory() {
+UsableDirectory ZORPerUserConfiguration::openBelow(const UsableDirectory& base, FileURL url, const char* function,
+                                                   const char* what) {
+    if (!base.opened)
+        return judged(std::move(url), base.opened.error(), function, what);
+    const std::string relative = url.path().substr(base.url.path().size() + 1);
+    return judged(std::move(url),
+                  fileManager_.openOrCreateDirectoryBelow(base.opened->get(), base.url, relative, Intermediates::yes,
+                                                          {.mode = 0755, .owner = userId_}),
+                  function, what);
+}
+
+std::optional<UsableDirectory> ZORPerUserConfiguration::openUserBaseDirectory() {
     const RecursiveMutexLock held(lock_);
     const auto home = userHomeDirectory();
     if (!home)
         return std::nullopt;
     FileURL url = StorePlaces::userBaseDirectory(*home);
-    makeDirectory(url, __func__, "user base");
-    return url;
+    auto opened = fileManager_.openOrCreateDirectoryAtURL(url, Intermediates::yes, {.mode = 0755, .owner = userId_});
+    return judged(std::move(url), std::move(opened), "userBaseDirectory", "user base");
+}
+
+std::optional<UsableDirectory> ZORPerUserConfiguration::openTransientDirectory() {
+    const RecursiveMutexLock held(lock_);
+    const auto base = openUserBaseDirectory();
+    if (!base)
+        return std::nullopt;
+    return openBelow(*base, StorePlaces::userTransientDirectory(*userHomeDirectory_), "transientDirectory",
+                     "transient");
+}
+
+std::optional<UsableDirectory> ZORPerUserConfiguration::openClassDirectory(ContainerClass containerClass,
+                                                                           bool transient) {
+    constexpr const char* function = "containerDirectoryURLForContentClass";
+    const RecursiveMutexLock held(lock_);
+    if (!isPerUserClass(containerClass)) {
+        log_.write(logLevelError, function, "Invalid class for a per user container directory: %llu",
+                   static_cast<unsigned long long>(containerClass));
+        return std::nullopt;
+    }
+    const auto base = transient ? openTransientDirectory() : openUserBaseDirectory();
+    if (!base)
+        return std::nullopt;
+    return openBelow(*base, base->url.appendingDirectory(className(containerClass)), function, "container");
+}
+
+std::optional<FileURL> ZORPerUserConfiguration::userBaseDirectory() {
+    auto base = openUserBaseDirectory();
+    return base ? std::optional(std::move(base->url)) : std::nullopt;
 }
 
 std::optional<FileURL> ZORPerUserConfiguration::transientDirectory() {
-    const RecursiveMutexLock held(lock_);
-    if (!userBaseDirectory())
-        return std::nullopt;
-    FileURL url = StorePlaces::userTransientDirectory(*userHomeDirectory_);
-    makeDirectory(url, __func__, "transient");
-    return url;
+    auto directory = openTransientDirectory();
+    return directory ? std::optional(std::move(directory->url)) : std::nullopt;
 }
 
 std::optional<FileURL> ZORPerUserConfiguration::containerDirectoryURLForContentClass(ContainerClass containerClass,
                                                                                      bool transient) {
-    const RecursiveMutexLock held(lock_);
-    if (!isPerUserClass(containerClass)) {
-        log_.write(logLevelError, __func__, "Invalid class for a per user container directory: %llu",
-                   static_cast<unsigned long long>(containerClass));
-        return std::nullopt;
-    }
-    const auto base = transient ? transientDirectory() : userBaseDirectory();
-    if (!base)
-        return std::nullopt;
-    FileURL url = base->appendingDirectory(className(containerClass));
-    makeDirectory(url, __func__, "container");
-    return url;
+    auto directory = openClassDirectory(containerClass, transient);
+    return directory ? std::optional(std::move(directory->url)) : std::nullopt;
 }
 
 } // namespace zor

@@ -17,6 +17,12 @@
 
 namespace zor {
 
+/// A directory that a getter has made or found, and whether it may be used. What is open was judged.
+struct UsableDirectory {
+    FileURL url;
+    Result<platform::FileDescriptor> opened;
+};
+
 class ZORPerUserConfiguration {
 public:
     /// nullptr, with a log line, for a user id outside 501 to 510.
@@ -39,12 +45,20 @@ public:
     std::optional<FileURL> transientDirectory();
     /// The class directory; absent (logged) for classes that are not per user.
     std::optional<FileURL> containerDirectoryURLForContentClass(ContainerClass containerClass, bool transient);
+    /// The same directory, for moving containers into it. Each of those that lead there from the home is judged on the
+    /// descriptor from which the next is reached.
+    std::optional<UsableDirectory> openClassDirectory(ContainerClass containerClass, bool transient);
 
 private:
     ZORPerUserConfiguration(std::uint32_t userId, const Log& log, ZORFileManager& fileManager,
                             const platform::PasswordDatabase& passwords)
         : userId_(userId), log_(log), fileManager_(fileManager), passwords_(passwords) {}
-    void makeDirectory(const FileURL& url, const char* function, const char* what);
+    std::optional<UsableDirectory> openUserBaseDirectory();
+    std::optional<UsableDirectory> openTransientDirectory();
+    /// Below `base`, unless that is no directory of the user's.
+    UsableDirectory openBelow(const UsableDirectory& base, FileURL url, const char* function, const char* what);
+    UsableDirectory judged(FileURL url, Result<platform::FileDescriptor> opened, const char* function,
+                           const char* what);
 
     const std::uint32_t userId_;
     const Log& log_;

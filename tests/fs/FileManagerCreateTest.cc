@@ -11,41 +11,119 @@ using support::LogLine;
 
 constexpr std::size_t bytesMax = 4096;
 
-// Goal: a directory, new or not, ends with the mode and owner asked for, whatever the process's mask; owner 0 leaves
-// ownership alone; no temporary name stays. Method: a table over what is there before.
+// Goal: a directory, new or not, ends with the mode and owner asked for, whatever the process's mask; but nobody else's
+// does for its name, nor is one opened that others could have put there; no temporary name stays. Method: a table over
+// what is there before, and who may write the directory above.
 TEST_F(FileManager, CreatesWithModeAndOwner) {
     if (!isRoot())
         GTEST_SKIP() << "skipped: needs root to give directories away";
     struct Row {
-        const char* before; // owner and mode of an existing one
+        const char* before; // mode and owner of an existing one
         DirectoryAttributes attributes;
         const char* after;
+        mode_t parentMode = 0755;
+        std::uint32_t parentOwner = 0;
     };
     const Row rows[] = {
         {nullptr, {.mode = 0755}, "040755 0:0"},
         {nullptr, {.mode = 0777, .owner = 501}, "040777 501:501"},
         {nullptr, {.mode = 0711, .owner = 33}, "040711 33:33"},
-        {"0700 502", {.mode = 0755, .owner = 501}, "040755 501:501"},
-        {"0700 502", {.mode = 0755}, "040755 502:502"},
+        {nullptr, {.mode = 0711, .owner = 502}, "040711 502:502", 01777, 501},
         {"1777 0", {.mode = 0755}, "040755 0:0"},
         {"0755 501", {.mode = 0755, .owner = 501}, "040755 501:501"},
+        {"0700 501", {.mode = 0755, .owner = 501}, "040755 501:501", 0755, 501},
+        {"0770 501:7", {.mode = 0755, .owner = 501}, "040755 501:501", 0755, 501},
+        // Others can have named them so.
+        {"0700 501", {.mode = 0755, .owner = 501}, "040700 501:501", 01777},
+        {"0700 501", {.mode = 0755, .owner = 501}, "040700 501:501", 0775, 501},
+        {"0700 501", {.mode = 0755, .owner = 501}, "040700 501:501", 0755, 502},
+        {"0770 501:7", {.mode = 0755, .owner = 501}, "040750 501:7", 01777},
+        {"0700 0", {.mode = 0777}, "040700 0:0", 0777},
+        {"0755 33", {.mode = 0711, .otherOwner = 33}, "040755 33:33"},
+        // They are another's.
+        {"0700 0", {.mode = 0755, .owner = 501}, "EPERM 040700 0:0", 0755, 501},
+        {"0700 502", {.mode = 0755, .owner = 501}, "EPERM 040700 502:502", 01777},
+        {"0700 502", {.mode = 0777, .protectionClass = 4}, "EPERM 040700 502:502", 0777},
     };
     const mode_t mask = ::umask(077);
     for (const Row& row : rows) {
+        SCOPED_TRACE(row.after);
+        makeDirectory("a", row.parentMode);
+        ASSERT_EQ(::chown(path("a").c_str(), row.parentOwner, row.parentOwner), 0);
         if (row.before) {
             unsigned mode = 0;
             unsigned owner = 0;
-            ASSERT_EQ(std::sscanf(row.before, "%o %u", &mode, &owner), 2);
-            makeDirectory("d", mode);
-            ASSERT_EQ(::chown(path("d").c_str(), owner, owner), 0);
+            unsigned group = 0;
+            if (std::sscanf(row.before, "%o %u:%u", &mode, &owner, &group) == 2)
+                group = owner;
+            makeDirectory("a/d", mode);
+            ASSERT_EQ(::chown(path("a/d").c_str(), owner, group), 0);
         }
-        const auto made = manager().createDirectoryAtURL(url("d"), Intermediates::no, row.attributes);
-        EXPECT_TRUE(made) << made.error().text();
-        EXPECT_EQ(item("d"), row.after);
-        EXPECT_EQ(names(""), (std::vector<std::string>{"d", "run"}));
-        ::rmdir(path("d").c_str());
+        const auto made = manager().createDirectoryAtURL(url("a/d"), Intermediates::no, row.attributes);
+        EXPECT_EQ((made ? "" : made.error().isPosix(EPERM) ? "EPERM " : made.error().text()) + item("a/d"), row.after);
+        EXPECT_EQ(names("a"), (std::vector<std::string>{"d"}));
+        ::rmdir(path("a/d").c_str());
+        ::rmdir(path("a").c_str());
     }
     ::umask(mask);
+}
+
+/// Puts another directory in the place of each new one, before anybody can open it.
+class ExchangingDisk final : public support::InterceptedDisk {
+public:
+    ExchangingDisk(Disk& inner, std::string other) : InterceptedDisk(inner), other_(std::move(other)) {}
+
+protected:
+    ssize_t intercept(const support::DiskCallInfo& info, const Make& make) override {
+        const ssize_t made = make();
+        if (info.call == DiskCall::makeDirectory) {
+            EXPECT_EQ(::renameat2(AT_FDCWD, other_.c_str(), info.fd, info.subject.c_str(), RENAME_EXCHANGE), 0);
+        }
+        return made;
+    }
+
+private:
+    const std::string other_;
+};
+
+// Goal: what is put in a new directory's place before it was given away is neither given away nor gets the final name.
+// Method: directories of several kinds, exchanged right after the making.
+TEST_F(FileManager, GivesNobodyWhatWasExchanged) {
+    if (!isRoot())
+        GTEST_SKIP() << "skipped: needs root to give directories away";
+    const struct {
+        mode_t mode;
+        uid_t owner;
+        bool full;
+    } rows[] = {{0700, 0, true}, {0755, 0, false}, {0700, 502, false}};
+    for (const auto& row : rows) {
+        makeDirectory("other", row.mode);
+        if (row.full)
+            makeFile("other/secret");
+        ASSERT_EQ(::chown(path("other").c_str(), row.owner, row.owner), 0);
+        const std::string before = item("other");
+        ExchangingDisk exchanging(disk, path("other"));
+        ZORFileManager manager(log, root(), exchanging, protection());
+        const auto made = manager.createDirectoryAtURL(url("d"), Intermediates::no, {.mode = 0755, .owner = 501});
+        ASSERT_FALSE(made);
+        EXPECT_TRUE(made.error().isPosix(EPERM)) << made.error().text();
+        EXPECT_EQ(item("d"), "missing");
+        const std::string exchanged = names("").front(); // "d." and a suffix
+        EXPECT_EQ(item(exchanged), before);
+        std::filesystem::remove_all(path(exchanged));
+        std::filesystem::remove_all(path("other"));
+    }
+}
+
+// Goal: the final name exists only when all is set. Method: fail each call of a creation.
+TEST_F(FileManager, AFailingDiskNeverLeavesAHalfMadeName) {
+    for (const DiskCall call :
+         {DiskCall::makeDirectory, DiskCall::rename, DiskCall::changeMode, DiskCall::changeOwner}) {
+        failNext(call, EIO);
+        EXPECT_FALSE(manager().createDirectoryAtURL(url("d"), Intermediates::no, {.owner = 501}));
+        EXPECT_TRUE(disk.met()) << support::nameOf(call);
+        EXPECT_EQ(names(""), std::vector<std::string>{"run"});
+    }
 }
 
 TEST_F(FileManager, IntermediateLevels) {
@@ -104,15 +182,12 @@ TEST_F(FileManager, GivesDirectoriesTheirClassAtCreation) {
 TEST_F(FileManager, TemporaryDirectories) {
     makeDirectory("row");
     const auto first = manager().createTemporaryDirectoryInDirectoryURL(url("row"));
-    const auto other = manager().createTemporaryDirectoryInDirectoryURL(url("row"), 501);
+    const auto other = manager().createTemporaryDirectoryInDirectoryURL(url("row"));
     ASSERT_TRUE(first && other);
     EXPECT_NE(first->path(), other->path());
     EXPECT_TRUE(first->lastPathComponent().starts_with("temp."));
     EXPECT_EQ(first->lastPathComponent().size(), 11U);
     EXPECT_TRUE(item("row/" + std::string(first->lastPathComponent())).starts_with("040700"));
-    if (isRoot()) {
-        EXPECT_EQ(item("row/" + std::string(other->lastPathComponent())), "040700 501:501");
-    }
     expectPosix(manager().createTemporaryDirectoryInDirectoryURL(url("nowhere")), ENOENT,
                 "Failed to create temp dir at path " + path("nowhere/temp.XXXXXX") + " : No such file or directory");
 }

@@ -49,6 +49,8 @@ protected:
     }
 
     [[nodiscard]] ZORFileManager& manager() { return *manager_; }
+    [[nodiscard]] const platform::SystemRoot& root() const { return *root_; }
+    [[nodiscard]] platform::FileProtectionClass& protection() { return *protection_; }
     [[nodiscard]] std::string path(const std::string& name) const { return directory_.path() + "/" + name; }
     [[nodiscard]] FileURL url(const std::string& name) const { return FileURL::directory(path(name)); }
 

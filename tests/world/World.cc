@@ -152,11 +152,16 @@ std::string World::path(std::string_view relative) const {
     return relative.empty() ? directory_.path() : directory_.path() + "/" + std::string(relative);
 }
 
-void World::makeDirectories(std::string_view relative, std::uint32_t owner, mode_t mode) const {
+void World::makeDirectories(std::string_view relative, std::optional<std::uint32_t> lastOwner, mode_t mode) const {
     for (std::size_t end = relative.find('/');; end = relative.find('/', end + 1)) {
         const std::string level = path(relative.substr(0, end));
         const bool last = end == std::string_view::npos;
-        if (::mkdir(level.c_str(), 0755) == 0 || last)
+        struct stat above{};
+        require(::stat(parentOf(level).c_str(), &above) == 0, parentOf(level));
+        // A level on the way is whose the one above it is, and a class of bundles the installer's.
+        const std::uint32_t usual = parentOf(level).ends_with("/containers/Bundle") ? bundleOwnerUserId : above.st_uid;
+        const std::uint32_t owner = last ? lastOwner.value_or(usual) : usual;
+        if (::mkdir(level.c_str(), 0755) == 0 || (last && (lastOwner || mode != 0755)))
             require(::chmod(level.c_str(), last ? mode : 0755) == 0 &&
                         (!canGiveAway() || ::chown(level.c_str(), owner, owner) == 0),
                     level);

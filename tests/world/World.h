@@ -19,6 +19,7 @@
 #include <atomic>
 #include <functional>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <sys/stat.h>
@@ -149,7 +150,9 @@ public:
     [[nodiscard]] std::string path(std::string_view relative = "") const;
     [[nodiscard]] FileURL url(std::string_view relative) const { return FileURL::directory(path(relative)); }
     [[nodiscard]] std::string relative(const std::string& absolute) const { return absolute.substr(path().size() + 1); }
-    void makeDirectories(std::string_view relative, std::uint32_t owner = 0, mode_t mode = 0755) const;
+    /// Missing levels; the last one of the owner and mode given, else the others' owner: that of the directory above.
+    void makeDirectories(std::string_view relative, std::optional<std::uint32_t> lastOwner = {},
+                         mode_t mode = 0755) const;
     void write(std::string_view relative, std::string_view bytes, mode_t mode = 0644) const;
     [[nodiscard]] std::string read(std::string_view relative) const;
     /// Empty when there is none.

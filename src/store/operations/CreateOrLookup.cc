@@ -20,6 +20,8 @@
 #include "store/StoreServices.h"
 #include "store/operations/ContainerBuilder.h"
 
+#include <cerrno>
+
 namespace zor {
 
 namespace {
@@ -135,12 +137,21 @@ Result<FoundContainer> ZORClientConnection::create(std::uint32_t userId, const s
         }();
         if (!built)
             return cleanUpStaging(staging, std::move(built).error());
-        const auto classDirectory =
-            services_.configuration.containerDirectoryURLForUser(userId, containerClass, transient);
         const std::string* wellKnown = services_.whitelist.wellknownContainerForId(identifier, containerClass);
-        if (classDirectory)
-            live = classDirectory->appendingDirectory(wellKnown ? *wellKnown : directoryName);
-        const auto moved = services_.fileManager.moveItemAtURL(staging, live);
+        const auto moved = [&]() -> Result<void> {
+            const auto classDirectory = services_.configuration.openClassDirectory(userId, containerClass, transient);
+            if (!classDirectory)
+                return posixError(here, ENOENT, "user %u has no home", userId);
+            live = classDirectory->url.appendingDirectory(wellKnown ? *wellKnown : directoryName);
+            const auto from = services_.fileManager.resolver().openParent(staging);
+            if (!from)
+                return posixError(here, from.error(), "rename of %s to %s failed: %s", staging.c_str(), live.c_str(),
+                                  errorText(from.error()));
+            if (!classDirectory->opened)
+                return classDirectory->opened.error();
+            TRY(services_.fileManager.moveItem(from->directory.get(), staging, classDirectory->opened->get(), live));
+            return {};
+        }();
         if (!moved)
             return cleanUpStaging(staging, makeError(services_.log, here, ErrorCode::moveToLiveFailed, &moved.error(),
                                                      LogFlag::yes, "Failed to move staging dir: %s to live dir: %s",

@@ -258,22 +258,23 @@ Result<void> ZORClientConnection::moveOldAway(const ReplaceRequest& request, Rep
 
 Result<void> ZORClientConnection::openDirectories(ReplaceProgress& progress, const FileURL& stagingUrl) {
     auto& directories = progress.directories;
-    const std::pair<FileDescriptor*, FileURL> wanted[] = {
-        {&directories.fresh, progress.newUrl},
-        {&directories.dest, progress.destUrl},
-        {&directories.old, progress.oldUrl},
-        {&directories.staging, stagingUrl},
-        {&directories.journals, services_.configuration.replaceDirectory().appendingFile("journal")}};
+    struct Wanted {
+        FileDescriptor* descriptor;
+        FileURL url;
+        std::uint32_t owner;
+    };
+    // Old and new one are of one class and user.
+    const std::uint32_t owner =
+        ZORGlobalConfiguration::ownerOfClassDirectory(progress.newRecord->containerClass(), progress.newRecord->uid());
+    const Wanted wanted[] = {
+        {&directories.fresh, progress.newUrl, owner},
+        {&directories.dest, progress.destUrl, owner},
+        {&directories.old, progress.oldUrl, owner},
+        {&directories.staging, stagingUrl, ownerUnchanged},
+        {&directories.journals, services_.configuration.replaceDirectory().appendingFile("journal"), ownerUnchanged}};
     constexpr std::size_t ofTheNewOne = 2;
-    for (const auto& [descriptor, url] :
-         std::span(wanted).first(progress.oldRecord ? std::size(wanted) : ofTheNewOne)) {
-        const FileURL directory = url.deletingLastPathComponent();
-        auto opened = services_.fileManager.resolver().openDirectory(directory);
-        if (!opened)
-            return posixError({replaceFunction, __LINE__}, opened.error(), "open of %s failed: %s", directory.c_str(),
-                              errorText(opened.error()));
-        *descriptor = std::move(*opened);
-    }
+    for (const Wanted& one : std::span(wanted).first(progress.oldRecord ? std::size(wanted) : ofTheNewOne))
+        *one.descriptor = TRY(services_.fileManager.openDirectoryOf(one.owner, one.url.deletingLastPathComponent()));
     return {};
 }
 
@@ -329,7 +330,8 @@ void ZORClientConnection::recoverFromException(const ReplaceProgress& progress) 
     if (services_.log.writes(logLevelDebug))
         services_.log.write(logLevelDebug, replaceFunction, "Recovering from exception by moving: %s to %s",
                             progress.stagingUrl.c_str(), progress.oldUrl.c_str());
-    const auto moved = fileManager.moveItemAtURL(progress.stagingUrl, progress.oldUrl);
+    const auto moved = fileManager.moveItem(progress.directories.staging.get(), progress.stagingUrl,
+                                            progress.directories.old.get(), progress.oldUrl);
     if (moved) {
         // Its record may have left the cache already. Should that fail, the next reading of its class finds it.
         (void)services_.cache.addContainerMetadata(progress.oldRecord, progress.oldRecord->uid(),

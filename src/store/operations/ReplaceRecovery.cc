@@ -146,7 +146,19 @@ Result<void> ZORClientConnection::applyReplaceJournal(const ReplaceJournal& jour
         if (log.writes(logLevelDebug))
             log.write(logLevelDebug, recoverFunction, "Recovering from failed replace by moving: %s to %s",
                       journal.stagingUrl.c_str(), journal.oldUrl.c_str());
-        if (const auto moved = services_.fileManager.moveItemAtURL(journal.stagingUrl, journal.oldUrl); !moved)
+        const auto moved = [&]() -> Result<void> {
+            ZORFileManager& fileManager = services_.fileManager;
+            const FileURL place = journal.oldUrl.deletingLastPathComponent();
+            const auto owner = services_.configuration.ownerOfClassDirectory(place);
+            if (!owner)
+                return posixError({recoverFunction, __LINE__}, EINVAL, "%s holds no containers", place.c_str());
+            const auto from =
+                TRY(fileManager.openDirectoryOf(ownerUnchanged, journal.stagingUrl.deletingLastPathComponent()));
+            const auto to = TRY(fileManager.openDirectoryOf(*owner, place));
+            TRY(fileManager.moveItem(from.get(), journal.stagingUrl, to.get(), journal.oldUrl));
+            return {};
+        }();
+        if (!moved)
             return failed(&moved.error());
     }
     if (!state->settled)

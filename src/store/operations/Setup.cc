@@ -154,26 +154,21 @@ void ZORClientConnection::reportOrphan(const FileURL& entry) {
 }
 
 std::uint64_t ZORClientConnection::_cleanupOrphanedDataForUser(std::uint32_t userId, ContainerClass containerClass) {
-    const auto directory = services_.configuration.containerDirectoryURLForUser(userId, containerClass, false);
-    if (!directory)
+    const auto directory = services_.configuration.openClassDirectory(userId, containerClass, false);
+    // What another's directory holds there is no orphan; the getter has said so.
+    if (!directory || !directory->opened)
         return 0;
-    const auto entries = services_.fileManager.urlsForItemsInDirectoryAtURL(*directory);
+    const auto entries = services_.fileManager.urlsForItemsInDirectoryAtURL(directory->url);
     if (!entries) {
         if (!entries.error().isPosix(ENOENT))
-            services_.log.write(logLevelError, __func__, "Failed to get items at %s : %s", directory->c_str(),
+            services_.log.write(logLevelError, __func__, "Failed to get items at %s : %s", directory->url.c_str(),
                                 entries.error().text().c_str());
-        return 0;
-    }
-    const auto opened = services_.fileManager.resolver().openDirectoryPath(*directory);
-    if (!opened) {
-        services_.log.write(logLevelError, __func__, "Failed to get items at %s : %s", directory->c_str(),
-                            errorText(opened.error()));
         return 0;
     }
     std::vector<Orphan> kinds(entries->size());
     fs::forEachStretch(kinds.size(), [&](std::size_t begin, std::size_t end) {
         for (std::size_t i = begin; i < end; ++i)
-            kinds[i] = orphanKind(opened->get(), (*entries)[i], containerClass);
+            kinds[i] = orphanKind(directory->opened->get(), (*entries)[i], containerClass);
     });
     std::uint64_t removed = 0;
     for (std::size_t i = 0; i < kinds.size(); ++i) {
@@ -188,7 +183,7 @@ std::uint64_t ZORClientConnection::_cleanupOrphanedDataForUser(std::uint32_t use
         // A failure has been logged where it happened; the next boot tries again.
         removed += _moveItemAtURLToDeathRow(entry, StartDeletionThread::no) ? 1 : 0;
     }
-    discardCopyLeftovers(*directory);
+    discardCopyLeftovers(directory->url);
     return removed;
 }
 

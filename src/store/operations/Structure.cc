@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// Two repairs of a container: its standard subdirectories made again, and a new name for its directory.
+// Two repairs of a container: its standard subdirectories made again, and a new name for its directory. Neither gives a
+// directory away because it has a wanted name: the container and each subdirectory are judged on the descriptor used.
 //
 // A stop leaves some subdirectories made, one perhaps not yet its owner's, until the repair is repeated; or the
 // container under its old or its new name; a mapping that then points to nothing is removed at the next launch.
@@ -7,9 +8,13 @@
 #include "store/StoreServices.h"
 #include "store/operations/ContainerLayout.h"
 
+#include <map>
 #include <optional>
+#include <string_view>
 
 namespace zor {
+
+using platform::FileDescriptor;
 
 Result<void> ZORClientConnection::recreateDefaultStructureForUser(const ContainerAddress& address) {
     return services_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
@@ -31,14 +36,27 @@ Result<void> ZORClientConnection::recreateDefaultStructureForUser(const Containe
 
 Result<void> ZORClientConnection::makeSubdirectories(const ContainerLayout& layout, std::vector<FileURL>& changed) {
     const FileURL container = changed.front();
+    ZORFileManager& fileManager = services_.fileManager;
+    // Each is reached from the one that was judged: what has its name by then may be another's.
+    std::map<std::string_view, FileDescriptor> open;
+    const auto make = [&](std::string_view path) -> Result<FileDescriptor> {
+        const std::size_t slash = path.rfind('/');
+        const std::string_view above = slash == path.npos ? "" : path.substr(0, slash);
+        if (!open.contains(above))
+            open.emplace("", TRY(fileManager.openDirectoryOf(layout.topLevelOwner, container)));
+        return fileManager.openOrCreateDirectoryBelow(
+            open.at(above).get(), above.empty() ? container : container.appendingDirectory(above),
+            std::string(path.substr(slash == path.npos ? 0 : slash + 1)), Intermediates::yes,
+            {.mode = layout.subdirectoryMode, .owner = layout.subdirectoryOwner});
+    };
     for (const char* subdirectory : layout.subdirectories) {
         changed.push_back(container.appendingDirectory(subdirectory));
-        const auto made = services_.fileManager.createDirectoryAtURL(
-            changed.back(), Intermediates::yes, {.mode = layout.subdirectoryMode, .owner = layout.subdirectoryOwner});
+        auto made = make(subdirectory);
         if (!made)
             return makeError(services_.log, {"_createSubDirectories", __LINE__}, ErrorCode::subdirectoryFailed,
                              &made.error(), LogFlag::yes, "Failed to create sub-dir at %s%s", container.c_str(),
                              subdirectory);
+        open.emplace(subdirectory, std::move(*made));
     }
     return {};
 }
@@ -54,7 +72,12 @@ Result<void> ZORClientConnection::regenerateDirectoryUUIDForUser(const Container
             const FileURL oldUrl = record->url();
             place = oldUrl.deletingLastPathComponent();
             const FileURL newUrl = place.appendingDirectory(UUID::random().string());
-            const auto moved = services_.fileManager.moveItemAtURL(oldUrl, newUrl);
+            const auto moved = [&]() -> Result<void> {
+                const auto directory = TRY(services_.fileManager.openDirectoryOf(
+                    ZORGlobalConfiguration::ownerOfClassDirectory(address.containerClass, address.userId), place));
+                TRY(services_.fileManager.moveItem(directory.get(), oldUrl, directory.get(), newUrl));
+                return {};
+            }();
             if (!moved)
                 return makeError(services_.log, {function, __LINE__}, ErrorCode::directoryNotRenamed, &moved.error(),
                                  LogFlag::yes, "Failed to move dir: %s to new UUID dir: %s", oldUrl.c_str(),
