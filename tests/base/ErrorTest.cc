@@ -25,23 +25,14 @@ using support::LogLine;
 // One line exactly when it is asked for, with the place and the cause.
 TEST(Error, IsLoggedOnceWhereItIsMade) {
     const ZORError cause = posixError({"rename", 7}, ENOENT, "rename of %s failed", "/a");
-    const LogLine plain{3, "operation", "42: Failed to move 5"};
-    const LogLine caused{3, "operation", plain.message + " (POSIX 2 \"rename of /a failed\")"};
-    for (const bool hasCause : {false, true}) {
-        for (const LogFlag flag : {LogFlag::no, LogFlag::yes}) {
-            support::RecordingLog sink(logLevelNotice);
-            const Log log(sink);
-            const ZORError error = makeError(log, {"operation", 42}, ErrorCode::moveToLiveFailed,
-                                             hasCause ? &cause : nullptr, flag, "Failed to move %d", 5);
-            const std::vector<LogLine> lines{hasCause ? caused : plain};
-            EXPECT_EQ(sink.take(), flag == LogFlag::yes ? lines : std::vector<LogLine>());
-            EXPECT_TRUE(error.is(ErrorCode::moveToLiveFailed));
-            EXPECT_EQ(error.replyCode(), static_cast<ErrorCode>(8));
-            EXPECT_EQ(error.description(), "Failed to move 5");
-            ASSERT_EQ(error.underlying() != nullptr, hasCause);
-            EXPECT_TRUE(!hasCause || error.underlying()->isPosix(ENOENT));
-        }
-    }
+    support::RecordingLog sink(logLevelNotice);
+    const Log log(sink);
+    for (const LogFlag flag : {LogFlag::no, LogFlag::yes})
+        for (const ZORError* underlying : {static_cast<const ZORError*>(nullptr), &cause})
+            EXPECT_TRUE(makeError(log, {"operation", 42}, ErrorCode::moveToLiveFailed, underlying, flag, "moving %d", 5)
+                            .is(ErrorCode::moveToLiveFailed));
+    EXPECT_EQ(sink.take(), (std::vector<LogLine>{{3, "operation", "42: moving 5"},
+                                                 {3, "operation", "42: moving 5 (POSIX 2 \"rename of /a failed\")"}}));
     const ZORError bare({"operation", 42}, ErrorDomain::zor, -3, std::nullopt);
     EXPECT_FALSE(bare.description());
     EXPECT_EQ(static_cast<std::uint64_t>(bare.replyCode()), 0xFFFF'FFFF'FFFF'FFFDU);
@@ -49,27 +40,16 @@ TEST(Error, IsLoggedOnceWhereItIsMade) {
     EXPECT_FALSE(cause.is(static_cast<ErrorCode>(2)));
 }
 
-// Every handle state against every level; the arguments of a line that is not written are not evaluated.
+// Every handle state (0: no handle) against every level; a line that is not written has its arguments not evaluated.
 TEST(Log, LevelGate) {
-    struct Row {
-        int handleLevel; // 0: no handle
-        std::vector<int> written;
-    };
-    for (const Row& row : {Row{0, {3, 5}}, Row{3, {3}}, Row{5, {3, 5}}, Row{6, {3, 5}}, Row{7, {3, 5, 7}}}) {
-        support::RecordingLog sink(row.handleLevel);
+    for (const auto& [handleLevel, written] : {std::pair(0, "35"), {3, "3"}, {5, "35"}, {6, "35"}, {7, "357"}}) {
+        support::RecordingLog sink(handleLevel);
         const Log log(sink);
-        std::vector<int> evaluated;
-        const auto note = [&](int level) {
-            evaluated.push_back(level);
-            return level;
-        };
+        std::string evaluated;
         for (const int level : {3, 5, 7})
-            ZOR_LOG(log, level, "level %d", note(level));
-        std::vector<int> written;
-        for (const LogLine& line : sink.take())
-            written.push_back(line.level);
-        EXPECT_EQ(written, row.written) << row.handleLevel;
-        EXPECT_EQ(evaluated, row.written) << row.handleLevel;
+            ZOR_LOG(log, level, "%s", (evaluated += std::to_string(level)).c_str());
+        EXPECT_EQ(evaluated, written) << handleLevel;
+        EXPECT_EQ(sink.take().size(), evaluated.size()) << handleLevel;
     }
 }
 
@@ -95,17 +75,11 @@ TEST(ExceptionBoundary, TurnsExceptionsIntoError40) {
     NoAnnotation annotation;
     ExceptionBoundary boundary(log, build, annotation);
 
-    EXPECT_EQ(boundary.run({"lookup", 1}, []() -> Result<int> { return 7; }), 7);
-    EXPECT_TRUE(sink.take().empty());
     const auto own = boundary.run({"lookup", 2}, []() -> Result<int> { throw ZORException("Range", "5 beyond 4"); });
     EXPECT_TRUE(!own && own.error().is(ErrorCode::exceptionCaught));
     const auto lines = sink.take(3, "lookup");
     ASSERT_EQ(lines.size(), 1U);
     EXPECT_TRUE(lines[0].starts_with("2: Got exception: Range: 5 beyond 4 : ")) << lines[0];
-    EXPECT_TRUE(lines[0].contains(", ")) << "no call stack: " << lines[0];
-    const auto foreign = boundary.run({"lookup", 3}, []() -> Result<int> { return std::vector<int>().at(1); });
-    EXPECT_TRUE(!foreign && foreign.error().is(ErrorCode::exceptionCaught));
-
     struct NoException {};
     EXPECT_THROW((void)boundary.run({"lookup", 4}, []() -> Result<int> { throw NoException(); }), NoException);
 }

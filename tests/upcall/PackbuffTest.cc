@@ -232,27 +232,16 @@ TEST(Packbuff, StaysInsideDamagedBytes) {
         }
 }
 
-// Goal: each kind of buffer is released once, as it was got. Method: pages that are looked for afterwards, pages that
-// cannot be released, a heap buffer (whose leak or double release the sanitizers see), one that stays the caller's.
+// Goal: each kind of buffer is released once, as it was got. Method: pages that are looked for afterwards, a heap
+// buffer (whose leak or double release the sanitizers see), one that stays the caller's.
 TEST(Packbuff, ReleasesItsBuffer) {
     const auto pageBytes = static_cast<std::size_t>(::getpagesize());
     void* const pages = ::mmap(nullptr, pageBytes, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
     ASSERT_NE(pages, MAP_FAILED);
-    sb_packbuff* packbuff = sb_packbuff_init_with_buffer(pages, pageBytes, false, packbuffDeallocPages);
-    EXPECT_NE(printed(packbuff).find("dealloc_type:    munmap()\n"), std::string::npos);
-    testing::internal::CaptureStdout();
-    sb_packbuff_free(packbuff);
-    EXPECT_EQ(testing::internal::GetCapturedStdout(), "");
+    sb_packbuff_free(sb_packbuff_init_with_buffer(pages, pageBytes, false, packbuffDeallocPages));
     unsigned char resident = 0;
     EXPECT_EQ(::mincore(pages, pageBytes, &resident), -1);
-
-    alignas(8) std::uint8_t own[32] = {};
-    testing::internal::CaptureStdout();
-    sb_packbuff_free(sb_packbuff_init_with_buffer(own + 8, 16, true, packbuffDeallocPages));
-    char expected[64];
-    std::snprintf(expected, sizeof expected, "failed: munmap(%p, 16)\n", static_cast<void*>(own + 8));
-    EXPECT_EQ(testing::internal::GetCapturedStdout(), expected);
-
+    alignas(8) std::uint8_t own[16] = {};
     sb_packbuff_free(sb_packbuff_init_with_buffer(std::malloc(16), 16, false, packbuffDeallocFree));
     sb_packbuff_free(sb_packbuff_init_with_buffer(own, 16, false, packbuffDeallocNone));
     sb_packbuff_free(nullptr);

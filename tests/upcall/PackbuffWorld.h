@@ -40,10 +40,6 @@ inline std::string toHex(std::span<const std::uint8_t> bytes) {
     return text;
 }
 
-inline std::string withoutAddresses(const std::string& text) {
-    return std::regex_replace(text, std::regex("0x[0-9a-f]+|\\(nil\\)"), "ADDRESS");
-}
-
 /// A file of tests/upcall/golden.
 inline ByteVector golden(const std::string& name) {
     std::ifstream file(std::string(ZORVANE_SOURCE_DIR) + "/tests/upcall/golden/" + name);
