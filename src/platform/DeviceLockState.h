@@ -15,7 +15,8 @@ public:
     static constexpr int locked = 1;
     /// One of these, or another number for another condition. Any thread.
     [[nodiscard]] virtual int currentState() const = 0;
-    /// Calls `changed` on the loop whenever the state may have changed. 0, else a status to log.
+    /// Calls `changed` on the loop whenever the state may have changed. 0, else a status to log: changes are then found
+    /// a moment late, until it can be done as it should.
     virtual int registerForChanges(RunLoop& loop, std::function<void()> changed) = 0;
     /// What the two log lines of a failed registration name.
     [[nodiscard]] virtual const char* registrationCallName() const = 0;

@@ -220,8 +220,8 @@ TEST(DeviceLockState, ForgetsWhatItKeptOfAFileThatChanges) {
 // Every change reaches the loop: rename, removal, writing in place; those of other files do not.
 TEST(DeviceLockState, TellsChanges) {
     const TestRoot test;
-    FileDeviceLockState state(test.root());
     EpollRunLoop loop;
+    FileDeviceLockState state(test.root());
     std::atomic<int> calls{0};
     std::atomic<int> seen{-2};
     const auto changed = [&] {

@@ -88,8 +88,8 @@ TEST(WantOfDescriptors, APeerIsRefusedAndNotMistaken) {
 TEST(WantOfDescriptors, AnUnlockIsSeenAfterwards) {
     const TestRoot test;
     const std::string directory = std::string(names::runtimeDirectory) + "/";
-    FileDeviceLockState state(test.root());
     EpollRunLoop loop;
+    FileDeviceLockState state(test.root());
     std::atomic<int> seen{DeviceLockState::locked};
     test.write(directory + "next", "0");
     test.write(directory + names::lockState, "1");
@@ -103,6 +103,49 @@ TEST(WantOfDescriptors, AnUnlockIsSeenAfterwards) {
     EXPECT_TRUE(eventually([&] { return seen == DeviceLockState::unlocked; }));
     loop.stop();
     runner.join();
+}
+
+// Goal: locks and unlocks are seen while the system gives no change notices, and notices are used as soon as it does.
+// Method: a user namespace that allows none, in a process of its own.
+TEST(WantOfNotices, AnUnlockIsSeenAllTheSame) {
+    enum { good, notTold, notSeen, stillPolls, cannot };
+    const TestRoot test;
+    const std::string file = std::string(names::runtimeDirectory) + "/" + names::lockState;
+    const pid_t child = ::fork();
+    if (child == 0) {
+        const auto allowNotices = [](const char* count) {
+            const FileDescriptor limit(::open("/proc/sys/user/max_inotify_instances", O_WRONLY | O_CLOEXEC));
+            return ::write(limit.get(), count, std::strlen(count)) > 0;
+        };
+        if (::unshare(CLONE_NEWUSER) != 0 || !allowNotices("0"))
+            ::_exit(cannot);
+        EpollRunLoop loop;
+        FileDeviceLockState state(test.root());
+        std::atomic<int> seen{FileDeviceLockState::unknown};
+        std::atomic<int> looks{0};
+        if (state.registerForChanges(loop, [&] {
+                seen = state.currentState();
+                ++looks;
+            }) != EMFILE)
+            ::_exit(notTold);
+        std::thread runner([&] { loop.run(); });
+        const auto sees = [&](int next) {
+            test.replace(file, std::to_string(next));
+            return eventually([&] { return seen == next; });
+        };
+        bool seenAll = sees(1) && sees(0) && allowNotices("8");
+        ::usleep(400'000);
+        const int before = looks;
+        ::usleep(600'000);
+        const bool polls = looks != before;
+        seenAll = seenAll && sees(1);
+        ::_exit(!seenAll ? notSeen : polls ? stillPolls : good);
+    }
+    int status = 0;
+    ::waitpid(child, &status, 0);
+    if (WEXITSTATUS(status) == cannot)
+        GTEST_SKIP() << "needs a user namespace";
+    EXPECT_EQ(WEXITSTATUS(status), good);
 }
 
 using support::NothingLarge;

@@ -1,8 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/linux/EpollRunLoop.h"
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
+#include <limits>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
 #include <system_error>
@@ -64,6 +66,65 @@ void EpollRunLoop::post(std::function<void()> job) {
     wake();
 }
 
+unsigned EpollRunLoop::addTimer(std::function<void()> job) {
+    auto shared = std::make_shared<std::function<void()>>(std::move(job));
+    const MutexLock lock(mutex_);
+    timers_[++lastTimer_] = {.job = std::move(shared), .due = {}};
+    return lastTimer_;
+}
+
+void EpollRunLoop::removeTimer(unsigned timer) {
+    // As with a watch: what the job holds goes after the lock.
+    std::shared_ptr<std::function<void()>> gone;
+    const MutexLock lock(mutex_);
+    if (const auto found = timers_.find(timer); found != timers_.end()) {
+        gone = std::move(found->second.job);
+        timers_.erase(found);
+    }
+}
+
+void EpollRunLoop::setTimer(unsigned timer, std::chrono::milliseconds delay) {
+    const auto due = std::chrono::steady_clock::now() + delay;
+    {
+        const MutexLock lock(mutex_);
+        const auto found = timers_.find(timer);
+        if (found == timers_.end() || (found->second.due && *found->second.due <= due))
+            return;
+        found->second.due = due;
+    }
+    wake();
+}
+
+int EpollRunLoop::millisecondsToNextTimer() {
+    std::optional<std::chrono::steady_clock::time_point> next;
+    {
+        const MutexLock lock(mutex_);
+        for (const auto& [number, timer] : timers_)
+            next = !next || (timer.due && *timer.due < *next) ? timer.due : next;
+    }
+    if (!next)
+        return -1;
+    const auto left = std::chrono::ceil<std::chrono::milliseconds>(*next - std::chrono::steady_clock::now()).count();
+    return static_cast<int>(std::clamp<std::int64_t>(left, 0, std::numeric_limits<int>::max()));
+}
+
+void EpollRunLoop::runDueTimers() {
+    const auto now = std::chrono::steady_clock::now();
+    for (;;) {
+        std::shared_ptr<std::function<void()>> job;
+        {
+            const MutexLock lock(mutex_);
+            const auto found = std::ranges::find_if(
+                timers_, [&](const auto& entry) { return entry.second.due && *entry.second.due <= now; });
+            if (found == timers_.end())
+                return;
+            found->second.due.reset();
+            job = found->second.job;
+        }
+        (*job)();
+    }
+}
+
 void EpollRunLoop::stop() {
     stop_.store(true, std::memory_order_release);
     wake();
@@ -73,7 +134,7 @@ void EpollRunLoop::run() {
     constexpr int eventsMax = 32;
     std::array<epoll_event, eventsMax> events{};
     while (!stop_.exchange(false, std::memory_order_acq_rel)) {
-        const int count = ::epoll_wait(epoll_.get(), events.data(), eventsMax, -1);
+        const int count = ::epoll_wait(epoll_.get(), events.data(), eventsMax, millisecondsToNextTimer());
         if (count < 0 && errno != EINTR)
             throw std::system_error(errno, std::generic_category(), "epoll_wait");
         for (int i = 0; i < count; ++i) {
@@ -83,6 +144,7 @@ void EpollRunLoop::run() {
             else if (const auto ready = callbackOf(serial))
                 (*ready)();
         }
+        runDueTimers();
         runPosted();
     }
 }

@@ -11,9 +11,11 @@
 #include "platform/RunLoop.h"
 
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <map>
 #include <memory>
+#include <optional>
 #include <vector>
 
 namespace zor::platform {
@@ -26,6 +28,9 @@ public:
     bool watch(int fd, std::function<void()> ready) override;
     void unwatch(int fd) override;
     void post(std::function<void()> job) override;
+    unsigned addTimer(std::function<void()> job) override;
+    void removeTimer(unsigned timer) override;
+    void setTimer(unsigned timer, std::chrono::milliseconds delay) override;
     void run() override;
     void stop() override;
 
@@ -34,7 +39,14 @@ private:
         int fd = -1;
         std::shared_ptr<std::function<void()>> ready;
     };
+    struct Timer {
+        std::shared_ptr<std::function<void()>> job;
+        std::optional<std::chrono::steady_clock::time_point> due;
+    };
     void wake();
+    /// For epoll_wait: until the next timer is due, rounded up; -1 when none is set.
+    [[nodiscard]] int millisecondsToNextTimer();
+    void runDueTimers();
     void drainWake();
     void runPosted();
     [[nodiscard]] std::shared_ptr<std::function<void()>> callbackOf(std::uint64_t serial);
@@ -46,6 +58,9 @@ private:
     /// By serial number, not by descriptor: an event of a descriptor that was closed and given out again is nobody's.
     std::map<std::uint64_t, Watch> watches_ ZOR_GUARDED_BY(mutex_);
     std::uint64_t lastSerial_ ZOR_GUARDED_BY(mutex_) = 0;
+    /// A few, by number.
+    std::map<unsigned, Timer> timers_ ZOR_GUARDED_BY(mutex_);
+    unsigned lastTimer_ ZOR_GUARDED_BY(mutex_) = 0;
     std::vector<std::function<void()>> posted_ ZOR_GUARDED_BY(mutex_);
 };
 

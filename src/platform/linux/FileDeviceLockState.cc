@@ -9,10 +9,11 @@
 
 #include <cerrno>
 #include <charconv>
+#include <chrono>
 #include <fcntl.h>
 #include <sys/inotify.h>
-#include <sys/timerfd.h>
 #include <unistd.h>
+#include <utility>
 
 namespace zor::platform {
 
@@ -20,7 +21,9 @@ namespace {
 
 constexpr std::size_t stateBytesMax = 32;
 /// A shortage that is over by then is hardly noticed, and one that lasts costs next to nothing.
-constexpr long againNanoseconds = 100'000'000;
+constexpr std::chrono::milliseconds again{100};
+/// Somebody waits for an unlock to be seen, and until a lock is seen retries go on; an idle device hardly notices this.
+constexpr std::chrono::milliseconds lookEvery{250};
 /// A file that was changed twice within one tick of the kernel's clock looks the same after both; one that was left
 /// alone for as long as this will not.
 constexpr time_t settledSeconds = 1;
@@ -78,10 +81,8 @@ int FileDeviceLockState::readState() const {
 int FileDeviceLockState::stateUnread(int error) const {
     if (error == ENOENT)
         return unlocked;
-    if (isOwnShortage(error) && again_.valid()) {
-        const itimerspec moment{.it_interval = {}, .it_value = {.tv_sec = 0, .tv_nsec = againNanoseconds}};
-        (void)::timerfd_settime(again_.get(), 0, &moment, nullptr);
-    }
+    if (isOwnShortage(error) && again_)
+        again_->set(again);
     return unknown;
 }
 
@@ -90,23 +91,36 @@ const char* FileDeviceLockState::notificationName() const {
 }
 
 int FileDeviceLockState::registerForChanges(RunLoop& loop, std::function<void()> changed) {
-    inotify_.reset(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
-    if (!inotify_.valid())
+    loop_ = &loop;
+    changed_ = std::move(changed);
+    again_.emplace(loop, [this] { lookAgain(); });
+    const int error = follow();
+    if (error != 0)
+        again_->set(lookEvery);
+    return error;
+}
+
+int FileDeviceLockState::follow() {
+    FileDescriptor inotify(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
+    if (!inotify.valid())
         return errno;
-    again_.reset(::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK));
-    if (!again_.valid())
-        return errno;
-    if (const auto watch = watchDirectory(inotify_.get(), root_.runtimeDirectory(), watchedEvents); !watch)
+    if (const auto watch = watchDirectory(inotify.get(), root_.runtimeDirectory(), watchedEvents); !watch)
         return watch.error();
-    const bool watched = loop.watch(inotify_.get(), [this, changed] {
+    const bool watched = loop_->watch(inotify.get(), [this] {
         if (takeEvents())
-            changed();
-    }) && loop.watch(again_.get(), [this, changed] {
-        std::uint64_t expirations = 0;
-        if (::read(again_.get(), &expirations, sizeof expirations) == sizeof expirations)
-            changed();
+            changed_();
     });
-    return watched ? 0 : ENOMEM;
+    if (!watched)
+        return ENOMEM;
+    inotify_ = std::move(inotify);
+    return 0;
+}
+
+void FileDeviceLockState::lookAgain() {
+    // Before the look: what changes after it is then noticed.
+    if (!inotify_.valid() && follow() != 0)
+        again_->set(lookEvery);
+    changed_();
 }
 
 bool FileDeviceLockState::takeEvents() const {

@@ -73,6 +73,7 @@ private:
     PassedSockets passed_;
     LinuxDisk disk_;
     RotatingLog log_;
+    EpollRunLoop runLoop_;
     LinuxInternalBuildQuery internalBuild_{root_};
     LinuxSystemVersionQuery systemVersion_{root_};
     LinuxPasswordDatabase passwords_{root_};
@@ -83,7 +84,6 @@ private:
     FileCrashAnnotation crash_{root_, disk_};
     SemaphoreBootMarker bootMarker_{root_};
     ServiceTransactions transactions_;
-    EpollRunLoop runLoop_;
     IdentityRegistry registry_;
     LinuxPeerIdentity peers_;
     SeqpacketUpcallPort upcallPort_;
