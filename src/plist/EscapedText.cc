@@ -11,9 +11,33 @@ namespace {
 
 constexpr std::string_view hexDigits = "0123456789abcdef";
 
-/// U+0080 to U+009F steer terminals like the ones below U+0020 do.
-bool isControl(char32_t character) {
-    return character < 0x20 || (character >= 0x7F && character < 0xA0);
+struct Range {
+    char32_t first;
+    char32_t last;
+};
+
+/// In order. U+0080 to U+009F steer terminals like the ones below U+0020 do; what turns the direction of writing makes
+/// a name read as another, and so does what is not seen.
+constexpr Range notShown[] = {
+    {0x00, 0x1F},       {0x7F, 0x9F},                         // controls
+    {0xAD, 0xAD},       {0x34F, 0x34F},                       // soft hyphen, grapheme joiner
+    {0x61C, 0x61C},                                           // Arabic letter mark
+    {0x115F, 0x1160},   {0x17B4, 0x17B5},   {0x180B, 0x180F}, // fillers and selectors of single scripts
+    {0x200B, 0x200F},                                         // of no width, marks of direction
+    {0x2028, 0x202E},                                         // ends of lines, embedding and override of direction
+    {0x2060, 0x206F},                                         // joiners, invisible operators, isolates of direction
+    {0x3164, 0x3164},   {0xFFA0, 0xFFA0},                     // Hangul fillers
+    {0xFE00, 0xFE0F},   {0xFEFF, 0xFEFF},                     // variation selectors, byte order mark
+    {0xFFF0, 0xFFFB},                                         // annotations
+    {0x1BCA0, 0x1BCA3}, {0x1D173, 0x1D17A},                   // formats of shorthand and music
+    {0xE0000, 0xE0FFF},                                       // tags, more variation selectors
+};
+
+bool isShown(char32_t character) {
+    if (character >= 0x20 && character < 0x7F)
+        return true;
+    return std::ranges::none_of(
+        notShown, [character](const Range& range) { return character >= range.first && character <= range.last; });
 }
 
 void appendHex(std::string& line, unsigned char byte) {
@@ -28,7 +52,7 @@ void appendEscaped(std::string& line, std::string_view text, Tabs tabs) {
     for (std::size_t i = 0; i < text.size();) {
         const Utf8Character character = decodeUtf8(text.substr(i));
         const bool isLeftTab = character.codePoint == '\t' && tabs == Tabs::stay;
-        if (character.length > 0 && (isLeftTab || !isControl(character.codePoint))) {
+        if (character.length > 0 && (isLeftTab || isShown(character.codePoint))) {
             line.append(text, i, character.length);
             i += character.length;
             continue;

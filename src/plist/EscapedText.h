@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// Text that others chose, for logs and terminals: nothing in it ends a line or steers what shows it.
+// Text that others chose, for logs and terminals: nothing in it ends a line, steers what shows it, turns the direction
+// in which it is read, or stays unseen.
 #pragma once
 
 #include <cstdint>
@@ -11,7 +12,8 @@ namespace zor::plist {
 /// A tab steers no terminal, but it can move a column of a table, or stand for its end.
 enum class Tabs : std::uint8_t { stay, escaped };
 
-/// Appends `text`: newlines as \n, other control characters and bytes that are no UTF-8 as \xNN.
+/// Appends `text`: newlines as \n; other control characters, characters that turn the direction of writing, end a line
+/// or are not seen, and bytes that are no UTF-8, as \xNN for each byte.
 void appendEscaped(std::string& line, std::string_view text, Tabs tabs = Tabs::stay);
 
 } // namespace zor::plist

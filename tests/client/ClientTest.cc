@@ -317,6 +317,7 @@ TEST(Client, NamesAreMadePrintable) {
               "31m",
               "\\x9b31m"},
              {"two\nlines\tand\x1b", "two\\nlines\\x09and\\x1b"},
+             {"gnp.\u202Egpj", "gnp.\\xe2\\x80\\xaegpj"},
          })
         EXPECT_EQ(printable(name), shown);
 }

@@ -6,8 +6,8 @@
 
 namespace zorvane {
 
-/// Newlines shown as \n, other control characters and bytes that are no UTF-8 as \xNN, so that a name cannot steer a
-/// terminal or look like two.
+/// Newlines shown as \n; other control characters, characters that turn the direction of writing or are not seen, and
+/// bytes that are no UTF-8, as \xNN for each byte: so that a name cannot steer a terminal, or look like two or another.
 [[nodiscard]] std::string printable(const std::string& text);
 
 } // namespace zorvane
