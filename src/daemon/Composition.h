@@ -20,6 +20,7 @@
 #include "migration/ZORContainerMigrator.h"
 #include "platform/Platform.h"
 #include "platform/RefusalLimiter.h"
+#include "platform/UserNumbers.h"
 #include "protection/ZORDataProtectionManager.h"
 #include "store/StoreServices.h"
 #include "store/ZORContainerCache.h"
@@ -61,10 +62,12 @@ public:
 private:
     struct Late;
     Late& late();
+    void sayLeftOut(uid_t uid, std::uint64_t lines) const;
 
     platform::Platform platform_;
     Log log_;
     platform::RefusalLimiter refusals_;
+    platform::LoopTimer refusalsEnd_;
     ExceptionBoundary boundary_;
     UserIdentity users_;
     ZORLocks locks_;

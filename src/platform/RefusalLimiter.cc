@@ -1,47 +1,76 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/RefusalLimiter.h"
 
+#include "platform/UserNumbers.h"
+
+#include <algorithm>
 #include <utility>
 
 namespace zor::platform {
 
 namespace {
-constexpr std::chrono::seconds window{1};
-}
+constexpr std::chrono::seconds second{1};
+constexpr std::chrono::minutes minute{1};
+} // namespace
 
-RefusalLimiter::RefusalLimiter(Report report, std::function<Clock::time_point()> now)
-    : report_(std::move(report)), now_(std::move(now)) {}
+RefusalLimiter::RefusalLimiter(Report report, Later later, std::function<Clock::time_point()> now)
+    : report_(std::move(report)), later_(std::move(later)), now_(std::move(now)) {}
 
-bool RefusalLimiter::admit(uid_t uid) {
-    EndedList ended;
+bool RefusalLimiter::admit(uid_t uid, std::size_t bytes) {
+    Outcome outcome;
     bool admitted = false;
     {
         const MutexLock lock(mutex_);
         const Clock::time_point now = now_();
-        collectEnded(now, ended);
-        Slot& slot = slotOf(uid, now, ended);
+        collectEnded(now, outcome);
+        Slot& slot = slotOf(countedUserId(uid), now, outcome);
         slot.lastSeen = now;
-        admitted = slot.written < linesPerSecondMax;
-        if (admitted)
-            ++slot.written;
-        else
-            ++slot.leftOut;
+        if (now - slot.lines.begun >= second)
+            slot.lines = {.begun = now};
+        if (now - slot.bytes.begun >= minute)
+            slot.bytes = {.begun = now};
+        const bool fewBytes = slot.bytes.written + bytes <= bytesPerMinuteMax;
+        admitted = fewBytes && slot.lines.written < linesPerSecondMax;
+        if (admitted) {
+            ++slot.lines.written;
+            slot.bytes.written += bytes;
+        } else {
+            const Clock::time_point over = fewBytes ? slot.lines.begun + second : slot.bytes.begun + minute;
+            const Clock::time_point before = slot.leftOut++ > 0 ? slot.saidAt : Clock::time_point::min();
+            slot.saidAt = std::max(before, over);
+            if (before < over)
+                outcome.later = over - now;
+        }
     }
-    say(ended);
+    act(outcome);
     return admitted;
 }
 
+void RefusalLimiter::reportEnded() {
+    Outcome outcome;
+    {
+        const MutexLock lock(mutex_);
+        const Clock::time_point now = now_();
+        collectEnded(now, outcome);
+        for (const Slot& slot : slots_) {
+            if (slot.leftOut > 0)
+                outcome.later = std::min(outcome.later.value_or(Clock::duration::max()), slot.saidAt - now);
+        }
+    }
+    act(outcome);
+}
+
 void RefusalLimiter::reportAll() {
-    EndedList ended;
+    Outcome outcome;
     {
         const MutexLock lock(mutex_);
         for (Slot& slot : slots_)
-            take(slot, ended);
+            take(slot, outcome);
     }
-    say(ended);
+    act(outcome);
 }
 
-RefusalLimiter::Slot& RefusalLimiter::slotOf(uid_t uid, Clock::time_point now, EndedList& ended) {
+RefusalLimiter::Slot& RefusalLimiter::slotOf(uid_t uid, Clock::time_point now, Outcome& outcome) {
     Slot* oldest = &slots_.front();
     for (Slot& slot : slots_) {
         if (slot.used && slot.uid == uid)
@@ -49,31 +78,30 @@ RefusalLimiter::Slot& RefusalLimiter::slotOf(uid_t uid, Clock::time_point now, E
         if (oldest->used && (!slot.used || slot.lastSeen < oldest->lastSeen))
             oldest = &slot;
     }
-    take(*oldest, ended);
-    *oldest = {.used = true, .uid = uid, .begun = now, .lastSeen = now, .written = 0, .leftOut = 0};
+    take(*oldest, outcome);
+    *oldest = {.used = true, .uid = uid, .lastSeen = now, .lines = {.begun = now}, .bytes = {.begun = now}};
     return *oldest;
 }
 
-void RefusalLimiter::collectEnded(Clock::time_point now, EndedList& ended) {
+void RefusalLimiter::collectEnded(Clock::time_point now, Outcome& outcome) {
     for (Slot& slot : slots_) {
-        if (!slot.used || now - slot.begun < window)
-            continue;
-        take(slot, ended);
-        slot.begun = now;
-        slot.written = 0;
+        if (slot.saidAt <= now)
+            take(slot, outcome);
     }
 }
 
-void RefusalLimiter::take(Slot& slot, EndedList& ended) {
+void RefusalLimiter::take(Slot& slot, Outcome& outcome) {
     if (slot.leftOut == 0)
         return;
-    ended.items[ended.count++] = {.uid = slot.uid, .leftOut = slot.leftOut};
+    outcome.ended[outcome.count++] = {.uid = slot.uid, .leftOut = slot.leftOut};
     slot.leftOut = 0;
 }
 
-void RefusalLimiter::say(const EndedList& ended) const {
-    for (std::size_t i = 0; i < ended.count; ++i)
-        report_(ended.items[i].uid, ended.items[i].leftOut);
+void RefusalLimiter::act(const Outcome& outcome) const {
+    for (std::size_t i = 0; i < outcome.count; ++i)
+        report_(outcome.ended[i].uid, outcome.ended[i].leftOut);
+    if (outcome.later)
+        later_(std::chrono::ceil<std::chrono::milliseconds>(*outcome.later));
 }
 
 } // namespace zor::platform

@@ -50,7 +50,11 @@ TEST(LogLine, EscapesWhatIsNoText) {
         {"caf\xc3\xa9 \xe2\x82\xac \xf0\x9f\x98\x80", "caf\xc3\xa9 \xe2\x82\xac \xf0\x9f\x98\x80"},
         {"\xc2\x9b"
          "31m",
-         "\\xc2\\x9b31m"},                            // U+009B begins a terminal's control sequence
+         "\\xc2\\x9b31m"},                                      // U+009B begins a terminal's control sequence
+        {"a\u202Eb\u2069", "a\\xe2\\x80\\xaeb\\xe2\\x81\\xa9"}, // what turns the direction of writing
+        {"\u2028\u2029\u0085", "\\xe2\\x80\\xa8\\xe2\\x80\\xa9\\xc2\\x85"},     // ends of lines
+        {"a\u200Bb\u00AD\uFEFF", "a\\xe2\\x80\\x8bb\\xc2\\xad\\xef\\xbb\\xbf"}, // what is not seen
+        {"\U000E0041", "\\xf3\\xa0\\x81\\x81"},
         {"\xff\xc3", "\\xff\\xc3"},                   // no UTF-8; a sequence that ends too early
         {"\xc0\x8a", "\\xc0\\x8a"},                   // an overlong newline
         {"\xed\xa0\x80", "\\xed\\xa0\\x80"},          // a surrogate
@@ -169,35 +173,58 @@ TEST(RotatingLog, WritesToStandardErrorWithoutWaitingForever) {
     EXPECT_EQ(log.lines().size(), 3001U);
 }
 
-// Each user has so many lines a second, what is left out is told exactly once, and the table of users is bounded.
+constexpr std::size_t shortLine = 100;
+
+// Each user has so many lines a second and bytes a minute, strangers together; what is left out is told exactly once,
+// when that time is over though nobody is refused any more; and the table of users is bounded.
 TEST(RefusalLimiter, CountsWhatItLeavesOut) {
+    using std::chrono::milliseconds;
     RefusalLimiter::Clock::time_point now{};
     std::map<uid_t, std::uint64_t> reported;
-    RefusalLimiter limiter([&](uid_t uid, std::uint64_t count) { reported[uid] += count; }, [&] { return now; });
-    const auto admitted = [&](uid_t uid, int attempts) {
+    milliseconds later{0};
+    RefusalLimiter limiter([&](uid_t uid, std::uint64_t count) { reported[uid] += count; },
+                           [&](milliseconds delay) { later = delay; }, [&] { return now; });
+    const auto admitted = [&](uid_t uid, int attempts, std::size_t bytes = shortLine) {
         int count = 0;
         for (int i = 0; i < attempts; ++i)
-            count += limiter.admit(uid) ? 1 : 0;
+            count += limiter.admit(uid, bytes) ? 1 : 0;
         return count;
+    };
+    const auto wait = [&](milliseconds time) {
+        now += time;
+        limiter.reportEnded();
     };
     EXPECT_EQ(admitted(501, 1000), 200);
     EXPECT_EQ(admitted(502, 150), 150);
     EXPECT_TRUE(reported.empty());
-    now += std::chrono::seconds(1);
-    EXPECT_EQ(admitted(502, 1), 1);
+    EXPECT_EQ(later, milliseconds(1000));
+    wait(later);
     EXPECT_EQ(reported, (std::map<uid_t, std::uint64_t>{{501, 800}}));
-    EXPECT_EQ(admitted(501, 300), 200);
-    limiter.reportAll(); // somebody looks before the second is over
+    // The minute's bytes: 204 lines of a hundred, five of four thousand.
+    EXPECT_EQ(admitted(501, 300), 4);
+    EXPECT_EQ(later, milliseconds(59'000));
+    EXPECT_EQ(admitted(503, 24, 4096), 5);
+    limiter.reportAll(); // somebody looks before the minute is over
     limiter.reportAll();
-    EXPECT_EQ(reported[501], 900U);
+    EXPECT_EQ(reported, (std::map<uid_t, std::uint64_t>{{501, 1096}, {503, 19}}));
     EXPECT_EQ(admitted(501, 1), 0) << "looking gives no new lines";
-    now += std::chrono::seconds(2);
+    EXPECT_EQ(admitted(503, 1, 4096), 0);
+    wait(milliseconds(59'000));
+    EXPECT_EQ(reported[501], 1097U);
+    EXPECT_EQ(reported[503], 19U);
+    EXPECT_EQ(later, milliseconds(1000));
+    wait(later);
+    EXPECT_EQ(reported[503], 20U);
+    EXPECT_EQ(admitted(501, 1), 1);
+    // A range of uids is one.
+    EXPECT_EQ(admitted(100'000, 150) + admitted(165'535, 150), 200);
     // More users than places, within one second: the count of whoever has to go is told.
+    wait(milliseconds(2000));
     EXPECT_EQ(admitted(1, 201), 200);
     reported.clear();
-    now += std::chrono::milliseconds(1);
-    for (uid_t uid = 1000; uid < 1000 + RefusalLimiter::usersMax; ++uid)
-        EXPECT_TRUE(limiter.admit(uid));
+    now += milliseconds(1);
+    for (uid_t uid = 100; uid < 100 + RefusalLimiter::usersMax; ++uid)
+        EXPECT_TRUE(limiter.admit(uid, shortLine));
     EXPECT_EQ(reported, (std::map<uid_t, std::uint64_t>{{1, 1}}));
 }
 

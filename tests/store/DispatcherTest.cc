@@ -222,16 +222,18 @@ TEST_F(Dispatch, Lists) {
               (Dictionary{{"ReplyError", std::uint64_t{11}}}));
 }
 
-// Goal: a refused client cannot fill the log, nor another's share. Method: more refusals than a second's share.
+// Goal: a refused client cannot fill the log, nor another's share. Method: more refusals than a second's share, and
+// lines that grow when they are escaped.
 TEST_F(Dispatch, RefusalsAreLimitedForEachUser) {
     constexpr std::size_t refusals = 2000;
     const auto refuse = [&] { handle({.kind = Kind::message, .request = {{"Command", 99}}, .reply = nullptr}); };
     for (std::size_t i = 0; i < refusals; ++i)
         refuse();
     EXPECT_LT(world.log.take(3, handler).size(), refusals);
-    as(grant("com.example", noPowers), second);
-    refuse();
-    EXPECT_EQ(world.log.take(3, handler).size(), 1U);
+    as(grant(std::string(1000, '\x01'), noPowers), second);
+    for (int i = 0; i < 24; ++i)
+        handle({.kind = Kind::message, .request = {{"Command", 1}}, .reply = nullptr});
+    EXPECT_EQ(world.log.take(3, "checkEntitlementsAndInitClientObject").size(), 4U);
 }
 
 } // namespace

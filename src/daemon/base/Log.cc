@@ -1,11 +1,25 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/base/Log.h"
 
+#include "plist/EscapedText.h"
+
 namespace zor {
 
 namespace {
+
 thread_local std::optional<std::uint32_t> provokingUserId;
+
+/// Time, process and level, before the function's name.
+constexpr std::size_t lineHeadBytes = 64;
+
+/// What a line takes: escapes are up to four times as long as what they stand for.
+std::size_t bytesInLog(const char* function, std::string_view message) {
+    std::string shown = function;
+    plist::appendEscaped(shown, message);
+    return lineHeadBytes + shown.size();
 }
+
+} // namespace
 
 Log::ClientScope::ClientScope(std::uint32_t userId) : outer_(provokingUserId) {
     provokingUserId = userId;
@@ -36,7 +50,8 @@ void Log::writeText(int level, const char* function, std::string_view message) c
     if (!writes(level))
         return;
     try {
-        if (level <= logLevelError && provokingUserId && refusalGate_ && !refusalGate_(*provokingUserId))
+        if (level <= logLevelError && provokingUserId && refusalGate_ &&
+            !refusalGate_(*provokingUserId, bytesInLog(function, message)))
             return;
         sink_.write(level, function, message);
     } catch (...) {

@@ -31,8 +31,9 @@ inline constexpr std::size_t shownBytesMax = 1024;
 
 class Log {
 public:
-    /// Decides whether a refusal provoked by a user id is written; may write the line that says how many were not.
-    using RefusalGate = std::function<bool(std::uint32_t userId)>;
+    /// Decides whether a refusal provoked by a user id is written, which takes so many bytes in the log; may write the
+    /// line that says how many were not.
+    using RefusalGate = std::function<bool(std::uint32_t userId, std::size_t bytes)>;
 
     explicit Log(platform::PlatformLog& sink) : sink_(sink) {}
     Log(const Log&) = delete;

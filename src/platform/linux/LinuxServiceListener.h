@@ -30,7 +30,7 @@ struct ListenerOptions {
     /// A listening socket that the service manager made; when valid it is used, and the address is not.
     FileDescriptor passed;
     ListenerLimits limits;
-    /// Gets lines for the log, at most one a second of each kind.
+    /// Gets lines for the log, now and then one of each kind.
     ListenerReport report;
 };
 

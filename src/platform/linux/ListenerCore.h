@@ -18,7 +18,8 @@ namespace zor::platform {
 
 struct ListenerCore {
     ListenerCore(const ListenerLimits& theLimits, ListenerReport report)
-        : limits(theLimits), charges(theLimits), incidents(std::move(report)), pool(theLimits) {}
+        : limits(theLimits), charges(theLimits), incidents(std::move(report), theLimits.incidentLineEvery),
+          pool(theLimits) {}
 
     [[nodiscard]] std::shared_ptr<ListenerConnection> unusedConnection() ZOR_EXCLUDES(mutex);
     /// The connection has ended and its object may be used for another.

@@ -38,7 +38,7 @@ std::string lineOf(ListenerIncident incident, std::int64_t about) {
 
 std::int64_t secondsNow() {
     const auto now = std::chrono::steady_clock::now().time_since_epoch();
-    return std::chrono::duration_cast<std::chrono::seconds>(now).count() + 1;
+    return std::chrono::duration_cast<std::chrono::seconds>(now).count();
 }
 
 } // namespace
@@ -47,9 +47,9 @@ void ListenerIncidents::happened(ListenerIncident incident, std::int64_t about) 
     const auto index = static_cast<std::size_t>(incident);
     Kind& kind = kinds_[index];
     const std::uint64_t count = ++kind.count;
-    std::int64_t last = kind.toldAtSeconds;
+    std::int64_t from = kind.tellFromSeconds;
     const std::int64_t now = secondsNow();
-    if (!report_ || last == now || !kind.toldAtSeconds.compare_exchange_strong(last, now))
+    if (!report_ || now < from || !kind.tellFromSeconds.compare_exchange_strong(from, now + lineEvery_.count()))
         return;
     const std::uint64_t told = kind.countTold.exchange(count);
     try {
@@ -58,7 +58,7 @@ void ListenerIncidents::happened(ListenerIncident incident, std::int64_t about) 
             line += formatted(" (and %llu more before)", static_cast<unsigned long long>(count - told - 1));
         report_(line);
     } catch (const std::exception&) {
-        return; // the next line of this kind is due in a second
+        return; // the next line of this kind is due in a while
     }
 }
 

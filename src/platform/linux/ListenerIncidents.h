@@ -1,10 +1,11 @@
 // SPDX-License-Identifier: Apache-2.0
-// What goes wrong on connections, counted, and told to whoever keeps the log: of each kind at most one line a second,
-// so that clients cannot fill it. Any thread.
+// What goes wrong on connections, counted, and told to whoever keeps the log: of each kind a line now and then, so that
+// clients cannot fill it. Any thread.
 #pragma once
 
 #include <array>
 #include <atomic>
+#include <chrono>
 #include <cstddef>
 #include <cstdint>
 #include <functional>
@@ -40,7 +41,8 @@ using ListenerReport = std::function<void(std::string_view line)>;
 
 class ListenerIncidents {
 public:
-    explicit ListenerIncidents(ListenerReport report) : report_(std::move(report)) {}
+    ListenerIncidents(ListenerReport report, std::chrono::seconds lineEvery)
+        : report_(std::move(report)), lineEvery_(lineEvery) {}
     /// `about` is the uid or the pid that the incident is about. Without memory the line is left out, not the count.
     void happened(ListenerIncident incident, std::int64_t about) noexcept;
     [[nodiscard]] std::uint64_t count(ListenerIncident incident) const;
@@ -49,10 +51,11 @@ private:
     struct Kind {
         std::atomic<std::uint64_t> count{0};
         std::atomic<std::uint64_t> countTold{0};
-        /// Of the steady clock; the first second is 1.
-        std::atomic<std::int64_t> toldAtSeconds{0};
+        /// Of the steady clock.
+        std::atomic<std::int64_t> tellFromSeconds{0};
     };
     const ListenerReport report_;
+    const std::chrono::seconds lineEvery_;
     std::array<Kind, listenerIncidentKinds> kinds_;
 };
 

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // How much of the daemon clients may take up through their connections, and how the pool that serves them is sized.
-// Tests make these smaller; nothing else changes them.
+// Tests make these smaller, and so does a process that may have few descriptors; nothing else changes them.
 #pragma once
 
 #include "ipc/Limits.h"
@@ -11,6 +11,10 @@
 namespace zor::platform {
 
 struct ListenerLimits {
+    /// The limits of a process that may have so many descriptors open: no crowd of connections takes those that the
+    /// daemon's work, the upcall and the status need, nor what is kept for the owners.
+    [[nodiscard]] static ListenerLimits forDescriptors(std::size_t descriptorsMax);
+
     /// Connections in all, and of any one user that does not own the root.
     std::size_t connectionsMax = 4096;
     std::size_t connectionsMaxPerUser = 1024;
@@ -36,6 +40,10 @@ struct ListenerLimits {
     /// meanwhile is not seen before the end. The first one may take any time.
     unsigned framesPerTurn = 16;
     std::chrono::microseconds turnMax{1000};
+
+    /// Between two lines of the log about one kind of incident: who provokes them all, over and over, writes as much as
+    /// one refused user does.
+    std::chrono::seconds incidentLineEvery{10};
 
     /// Threads that run handlers at once; 0 means one for each processor, and no fewer than 2.
     unsigned threadsRunning = 0;
