@@ -19,6 +19,7 @@
 #include <malloc.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
+#include <utility>
 
 namespace {
 
@@ -35,12 +36,24 @@ constexpr int mallocArenas = 2;
     ::mallopt(M_ARENA_MAX, mallocArenas);
     std::signal(SIGPIPE, SIG_IGN);
     std::signal(SIGXFSZ, SIG_IGN); // a file that may not grow fails the write (EFBIG), not the daemon
-    rlimit files{};
-    if (::getrlimit(RLIMIT_NOFILE, &files) == 0) {
-        files.rlim_cur = files.rlim_max; // a connection takes two or three
-        ::setrlimit(RLIMIT_NOFILE, &files);
-    }
     return true;
+}
+
+/// As many descriptors as this process can get.
+std::size_t raiseDescriptorLimit() {
+    rlimit files{};
+    if (::getrlimit(RLIMIT_NOFILE, &files) != 0)
+        return 0;
+    const rlim_t before = std::exchange(files.rlim_cur, files.rlim_max);
+    return ::setrlimit(RLIMIT_NOFILE, &files) == 0 ? files.rlim_max : before;
+}
+
+void sayIfConnectionsAreFew(const platform::ListenerLimits& limits, std::size_t descriptorsMax, const Log& log) {
+    if (limits.connectionsMax < platform::ListenerLimits{}.connectionsMax)
+        log.write(logLevelNotice, "main",
+                  "At most %zu connections, %zu of one user, for there are %zu descriptors; raise LimitNOFILE= of the "
+                  "unit, or ulimit -Hn",
+                  limits.connectionsMax, limits.connectionsMaxPerUser, descriptorsMax);
 }
 
 platform::Syncs syncsFromEnvironment() {
@@ -113,12 +126,15 @@ int main(int argumentCount, char** arguments) {
         return 1;
     }
 
+    const std::size_t descriptorsMax = raiseDescriptorLimit();
+    const auto limits = platform::ListenerLimits::forDescriptors(descriptorsMax);
     using platform::RotatingLog;
     auto platform = platform::LinuxPlatform::open({
         .rootDirectory = options->rootDirectory,
         .foreground = options->foreground ? RotatingLog::Foreground::yes : RotatingLog::Foreground::no,
         .syncs = syncsFromEnvironment(),
         .passed = platform::PassedSockets::ofEnvironment(),
+        .listenerLimits = limits,
     });
     if (!platform) {
         std::fprintf(stderr, "zorvaned: %s\n", platform.error().c_str());
@@ -139,7 +155,11 @@ int main(int argumentCount, char** arguments) {
         [&](platform::Peer& peer, platform::StatusSocket::Detail detail) { return status.forPeer(peer, detail); });
     Daemon daemon(composition, {.logLevel = options->logLevel,
                                 .containersPerUser = options->containersPerUser,
-                                .beforeClients = [&] { openStatus(**platform, statusSocket, composition.log()); },
+                                .beforeClients =
+                                    [&] {
+                                        sayIfConnectionsAreFew(limits, descriptorsMax, composition.log());
+                                        openStatus(**platform, statusSocket, composition.log());
+                                    },
                                 .ready = [&] { (void)notify.send("READY=1"); }});
     const int exitStatus = daemon.run();
     (void)notify.send("STOPPING=1");

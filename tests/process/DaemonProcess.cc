@@ -80,14 +80,14 @@ void DaemonProcess::registerProgram(const std::string& fileName, const std::stri
                   "</dict></plist>");
 }
 
-void DaemonProcess::start(const std::vector<std::string>& moreArguments) {
+void DaemonProcess::start(const std::vector<std::string>& moreArguments, const std::function<bool()>& prepare) {
     std::vector<std::string> words = {programPath("zorvaned"), "--root", root()};
     words.insert(words.end(), moreArguments.begin(), moreArguments.end());
     if (syncs_ == Syncs::off)
         ::setenv("ZORVANE_DURABILITY", "none", 1);
     else
         ::unsetenv("ZORVANE_DURABILITY");
-    daemon_.emplace(words);
+    daemon_.emplace(words, prepare);
     for (int tries = 0; tries < 3000 && running(); ++tries) {
         if (zorvane::Client::connect(connection()))
             return;

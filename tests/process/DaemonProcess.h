@@ -29,8 +29,8 @@ public:
     DaemonProcess(const DaemonProcess&) = delete;
     DaemonProcess& operator=(const DaemonProcess&) = delete;
 
-    /// Starts the daemon and waits until clients can connect.
-    void start(const std::vector<std::string>& moreArguments = {});
+    /// Starts the daemon and waits until clients can connect. `prepare` as Program's.
+    void start(const std::vector<std::string>& moreArguments = {}, const std::function<bool()>& prepare = {});
     /// SIGKILL, and waits for the end.
     void kill();
     /// SIGTERM; the exit status.

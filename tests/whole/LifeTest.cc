@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // The daemon's life as its users see it: killed at any moment, started twice, told to stop, asked by its tool.
+#include "platform/FileDescriptor.h"
 #include "process/DaemonProcess.h"
 #include "process/Relay.h"
 #include "support/LongRun.h"
@@ -10,10 +11,14 @@
 #include <filesystem>
 #include <future>
 #include <gtest/gtest.h>
+#include <poll.h>
 #include <random>
 #include <sched.h>
 #include <set>
 #include <sys/resource.h>
+#include <sys/socket.h>
+#include <sys/syscall.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 #include <thread>
 #include <unistd.h>
@@ -63,6 +68,37 @@ TEST(Life, TheProcOfAnotherPidNamespace) {
     EXPECT_NE(daemon.said().find("zorvaned: /proc is not mounted or belongs to another pid namespace"),
               std::string::npos)
         << daemon.said();
+}
+
+// Goal: where there are few descriptors, users that hold all the connections that they get shut out neither root, nor
+// the upcall, nor the status. Method: three users connect as often as the daemon has descriptors.
+TEST(Life, FewDescriptorsAreShared) {
+    constexpr rlim_t descriptors = 512;
+    if (::geteuid() != 0)
+        GTEST_SKIP() << "needs root: it connects under other uids";
+    const rlimit few{.rlim_cur = descriptors, .rlim_max = descriptors};
+    DaemonProcess daemon;
+    daemon.start({}, [&] { return ::setrlimit(RLIMIT_NOFILE, &few) == 0; });
+    const auto connect = [&](uid_t uid, int type, const std::string& name) {
+        sockaddr_un address{.sun_family = AF_UNIX, .sun_path = {}};
+        daemon.path("run/zorvane/" + name).copy(address.sun_path, sizeof address.sun_path - 1);
+        platform::FileDescriptor socket(::socket(AF_UNIX, type | SOCK_CLOEXEC, 0));
+        (void)::syscall(SYS_setresuid, -1, uid, -1);
+        const int failed = ::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address);
+        (void)::syscall(SYS_setresuid, -1, 0, -1);
+        EXPECT_EQ(failed, 0) << errno;
+        return socket;
+    };
+    std::vector<platform::FileDescriptor> idle;
+    for (const uid_t uid : {501U, 502U, 100'000U})
+        for (rlim_t i = 0; i < descriptors; ++i)
+            idle.push_back(connect(uid, SOCK_STREAM, "com.veltra.zorvaned"));
+    zorvane::Client client = daemon.client();
+    EXPECT_TRUE(client.createOrLookup(dataContainer("a")));
+    EXPECT_GT(daemon.counter("Connections"), 3 * 16);
+    const platform::FileDescriptor agent = connect(0, SOCK_SEQPACKET, "com.veltra.zorvaned.upcall");
+    pollfd refused{.fd = agent.get(), .events = POLLIN, .revents = 0};
+    EXPECT_EQ(::poll(&refused, 1, 100), 0) << "the upcall's connection was closed";
 }
 
 // Goal: a file that may not grow any further is an error that is told, by the daemon and by the tool, and no end.
