@@ -142,7 +142,7 @@ void WorkCheck::checkBootMarker() {
     const platform::BootMarker::State state = marker.look();
     const FileURL url = FileURL::directory(platform::names::semaphoreDirectory)
                             .appendingFile(platform::names::semaphoreFilePrefix + marker.name());
-    if (state.foreign)
+    if (state.foreign && !state.present)
         look_.add(FindingCode::bootMarkerForeign, url, "is the boot marker's name, and somebody else's file",
                   Mender::launch);
     else if (!state.present && look_.options().daemonServes)

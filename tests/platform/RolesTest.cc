@@ -17,6 +17,8 @@
 #include <csignal>
 #include <cstring>
 #include <filesystem>
+#include <functional>
+#include <span>
 #include <sys/wait.h>
 #include <sys/xattr.h>
 #include <unistd.h>
@@ -129,7 +131,8 @@ TEST(CrashAnnotation, KeepsTheLastMessageWhole) {
     EXPECT_EQ(test.read(file), "second, longer");
 }
 
-// The marker is per root, made once, and only one of ours counts, not what others could plant.
+// The marker is per root, and only one of ours counts, not what others could plant. Each mark is judged without the
+// other one.
 TEST(BootMarker, BelievesOnlyItsOwn) {
     const TestRoot test;
     const TestRoot other;
@@ -139,34 +142,47 @@ TEST(BootMarker, BelievesOnlyItsOwn) {
     EXPECT_EQ(marker.name().size(), std::string(names::bootMarker).size() + 17);
     EXPECT_NE(marker.name(), SemaphoreBootMarker(other.root()).name());
     EXPECT_EQ(marker.name(), SemaphoreBootMarker(test.root()).name());
-    EXPECT_EQ(SemaphoreBootMarker(SystemRoot::open("/").value()).name(), "zorvaned.fb_check");
-    const std::string file = "/dev/shm/sem." + marker.name();
+    const SystemRoot deviceRoot = SystemRoot::open("/").value();
+    EXPECT_EQ(SemaphoreBootMarker(deviceRoot).name(), "zorvaned.fb_check");
+    const std::string semaphore = "/dev/shm/sem." + marker.name();
+    const std::string file = test.path(std::string(names::runtimeDirectory) + "/" + names::bootMarkerFile);
     EXPECT_FALSE(marker.look().present);
-    ASSERT_EQ(marker.make(), 0);
-    EXPECT_TRUE(marker.look().present);
-    EXPECT_EQ(marker.make(), EEXIST);
-    // A second name of it, or a mode that lets others in, is not what the daemon made.
-    ASSERT_EQ(::link(file.c_str(), (file + ".link").c_str()), 0);
-    EXPECT_TRUE(marker.look().foreign);
-    ::unlink((file + ".link").c_str());
-    EXPECT_TRUE(marker.look().present);
-    ::chmod(file.c_str(), 0666);
-    EXPECT_FALSE(marker.look().present);
-    EXPECT_EQ(marker.make(), 0) << "a foreign one is replaced";
+    const auto link = [](const std::string& mark) { (void)::link(mark.c_str(), (mark + ".link").c_str()); };
+    const auto open = [](const std::string& mark) { ::chmod(mark.c_str(), 0666); };
+    const auto symbolic = [&](const std::string& mark) {
+        ::unlink(mark.c_str());
+        (void)::symlink(test.path("run").c_str(), mark.c_str());
+    };
+    const auto given = [](const std::string& mark) { (void)::chown(mark.c_str(), 501, 501); };
+    const std::function<void(const std::string&)> tricks[] = {link, open, symbolic, given};
+    for (const auto& trick : std::span(tricks).first(::geteuid() == 0 ? 4 : 3))
+        for (const auto& [mark, otherMark] : {std::pair(semaphore, file), std::pair(file, semaphore)}) {
+            ASSERT_EQ(marker.make(), 0) << "a foreign one is replaced";
+            ASSERT_EQ(::unlink(otherMark.c_str()), 0);
+            EXPECT_TRUE(marker.look().present) << mark;
+            EXPECT_FALSE(marker.look().foreign);
+            trick(mark);
+            EXPECT_FALSE(marker.look().present) << mark;
+            EXPECT_EQ(marker.look().foreign, mark == semaphore);
+            ::unlink((mark + ".link").c_str());
+        }
+    // Who keeps the semaphore's name taken makes no launch a boot.
     marker.forget();
-    marker.forget();
-    ASSERT_EQ(::symlink(test.path("run").c_str(), file.c_str()), 0);
-    EXPECT_TRUE(marker.look().foreign);
+    ASSERT_EQ(::mkdir(semaphore.c_str(), 0755) | ::mkdir((semaphore + "/kept").c_str(), 0755), 0);
     EXPECT_EQ(marker.make(), 0);
-    EXPECT_TRUE(marker.look().present);
-    if (::geteuid() == 0) {
-        ASSERT_EQ(::chown(file.c_str(), 501, 501), 0);
-        EXPECT_TRUE(marker.look().foreign);
-        EXPECT_EQ(marker.make(), 0);
-        EXPECT_TRUE(marker.look().present);
-    }
+    EXPECT_TRUE(marker.look().present && marker.look().foreign);
+    ::rmdir((semaphore + "/kept").c_str());
+    EXPECT_EQ(marker.make(), 0);
+    EXPECT_FALSE(marker.look().foreign);
+    // A file of another boot says nothing of this one.
+    marker.forget();
     marker.forget();
     EXPECT_FALSE(marker.look().present);
+    test.write(std::string(names::runtimeDirectory) + "/" + names::bootMarkerFile,
+               "00000000-0000-4000-8000-000000000000\n");
+    ::chmod(file.c_str(), 0400);
+    EXPECT_FALSE(marker.look().present);
+    marker.forget();
 }
 
 const std::string lockStateFile = std::string(names::runtimeDirectory) + "/" + names::lockState;

@@ -39,6 +39,10 @@ inline constexpr const char* bootMarker = "zorvaned.fb_check";
 /// Where the C library keeps a semaphore named X: in the file sem.X there.
 inline constexpr const char* semaphoreDirectory = "/dev/shm";
 inline constexpr const char* semaphoreFilePrefix = "sem.";
+/// The second boot marker, in runtimeDirectory.
+inline constexpr const char* bootMarkerFile = "zorvaned.boot";
+/// The kernel's name of this boot.
+inline constexpr const char* bootIdentifier = "/proc/sys/kernel/random/boot_id";
 
 // Extended attribute with a data-protection class: the first where the daemon is root.
 inline constexpr const char* protectionAttribute = "trusted.zorvane.protection";
