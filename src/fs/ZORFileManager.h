@@ -96,9 +96,10 @@ public:
     /// Every entry of the tree to the visitor, directories before and after what they hold.
     Result<void> _traverseDirectory(const FileURL& url,
                                     const std::function<Result<void>(const fs::WalkEntry&)>& visitor);
-    /// Owner of everything but metadata files; 0755 for directories and what has an execute bit, else 0644. A file with
-    /// a name outside the tree is left alone.
-    Result<void> standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid);
+    /// Gives everything that belonged to `formerOwner` to the new one, but metadata files and files with a name outside
+    /// the tree; that and what is the new one's becomes 0755, for directories and what has an execute bit, else 0644.
+    /// Anybody else's keeps owner and mode, and is said.
+    Result<void> standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid, uid_t formerOwner);
     /// The entries whose names do not begin with ".", in the directory's order.
     Result<std::vector<FileURL>> urlsForItemsInDirectoryAtURL(const FileURL& directory);
     /// What moves across file systems that were cut short left in a directory. Empty when it cannot be read.
@@ -164,8 +165,14 @@ private:
     Result<void> setDirectoryClass(int directory, const std::string& path, int protectionClass);
     /// Who a directory for `owner` belongs to in the end.
     [[nodiscard]] uid_t ownerToBe(std::uint32_t owner) const;
+    struct Standard {
+        uid_t uid;
+        gid_t gid;
+        uid_t formerOwner;
+        std::uint64_t others = 0; // items that are anybody else's
+    };
     /// `directory` is the entry's own descriptor where it is a directory that is open, else negative.
-    void standardizeEntry(int parent, const char* name, int directory, const std::string& path, uid_t uid, gid_t gid,
+    void standardizeEntry(int parent, const char* name, int directory, const std::string& path, Standard& standard,
                           fs::NamesMet& namesMet);
 
     const Log& log_;

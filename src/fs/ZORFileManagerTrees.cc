@@ -28,6 +28,9 @@ std::string below(const FileURL& root, const std::string& relative) {
     return relative.empty() ? root.path() : root.path() + "/" + relative;
 }
 
+/// Lines of one pass about items that stay somebody else's: who put them there may have put a million.
+constexpr std::uint64_t othersSaidMax = 100;
+
 /// 0755 for directories and whatever somebody may execute, else 0644.
 mode_t standardMode(mode_t mode) {
     return S_ISDIR(mode) || (mode & 0111) ? 0755 : 0644;
@@ -226,9 +229,10 @@ Result<void> ZORFileManager::_traverseDirectory(const FileURL& url,
     return {};
 }
 
-void ZORFileManager::standardizeEntry(int parent, const char* name, int directory, const std::string& path, uid_t uid,
-                                      gid_t gid, fs::NamesMet& namesMet) {
+void ZORFileManager::standardizeEntry(int parent, const char* name, int directory, const std::string& path,
+                                      Standard& standard, fs::NamesMet& namesMet) {
     constexpr const char* function = "standardizeOwnershipAtURL";
+    const auto [uid, gid, formerOwner, others] = standard;
     const auto notGiven = [&](int number) {
         log_.write(logLevelError, function, "Could not chown %s: %s", ZOR_SHOWN(path), errorText(number));
     };
@@ -246,6 +250,14 @@ void ZORFileManager::standardizeEntry(int parent, const char* name, int director
     struct stat status{};
     if (::fstat(item, &status) != 0)
         return notGiven(errno);
+    // The former owner can have named another's file or directory so that it lies here.
+    if (daemon_ == 0 && status.st_uid != formerOwner && status.st_uid != uid) {
+        if (others < othersSaidMax)
+            log_.write(logLevelError, function, "%s belongs to user %u: it keeps its owner and mode", ZOR_SHOWN(path),
+                       status.st_uid);
+        ++standard.others;
+        return;
+    }
     // A file with another name elsewhere may belong to somebody else's tree. A name counts once its directory has been
     // given away: before, the former owner could move it on and have it counted again.
     const bool sharedElsewhere =
@@ -259,24 +271,29 @@ void ZORFileManager::standardizeEntry(int parent, const char* name, int director
         log_.write(logLevelError, function, "Could not chmod %s: %s", ZOR_SHOWN(path), errorText(-changed));
 }
 
-Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid) {
+Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid, uid_t formerOwner) {
+    Standard standard{.uid = uid, .gid = gid, .formerOwner = formerOwner};
     const bool rootIsMetadata = url.path().find(names::metadataFile) != std::string::npos;
     fs::NamesMet namesMet;
     Result<void> walked = _traverseDirectory(url, [&](const WalkEntry& entry) -> Result<void> {
         const std::string path = below(url, entry.path());
         if (entry.kind != WalkEntryKind::directoryEnd && !entry.onOtherFileSystem &&
             path.find(names::metadataFile) == std::string::npos)
-            standardizeEntry(entry.parent, entry.name, entry.directory, path, uid, gid, namesMet);
+            standardizeEntry(entry.parent, entry.name, entry.directory, path, standard, namesMet);
         return {};
     });
+    if (standard.others > othersSaidMax)
+        log_.write(logLevelError, __func__, "%llu more items below %s keep their owner and mode",
+                   static_cast<unsigned long long>(standard.others - othersSaidMax), url.c_str());
     const auto parent = resolver_.openParent(url);
     struct stat status{};
     const int failure = parent ? resolver_.status(url, status) : parent.error();
     if (failure != 0)
         return posixError(ZOR_HERE, failure, "Could not stat %s: %s", url.c_str(), errorText(failure));
-    fs::NamesMet again; // the root's name has been counted
+    fs::NamesMet again;              // the root's name has been counted
+    standard.others = othersSaidMax; // the root has been said
     if (!rootIsMetadata)
-        standardizeEntry(parent->directory.get(), parent->name.c_str(), -1, url.path(), uid, gid, again);
+        standardizeEntry(parent->directory.get(), parent->name.c_str(), -1, url.path(), standard, again);
     return walked;
 }
 

@@ -8,6 +8,7 @@
 #include "store/Names.h"
 #include "store/StoreServices.h"
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <ctime>
@@ -99,7 +100,8 @@ ZORContainerMigrator::Outcome ZORContainerMigrator::performMigrationWithError() 
         adoptBundlesOfClass(containerClass, count);
     log.write(logLevelNotice, migrationFunction, "Changing ownership of bundle container content. %llu errors so far",
               static_cast<unsigned long long>(count.errors));
-    auto owned = services_.fileManager.standardizeOwnershipAtURL(bundles, bundleOwnerUserId, bundleOwnerUserId);
+    auto owned = services_.fileManager.standardizeOwnershipAtURL(bundles, bundleOwnerUserId, bundleOwnerUserId,
+                                                                 firstMobileUserId);
     if (owned)
         if (const int failure = orderBeforeMarker(bundles); failure < 0)
             owned = posixError({migrationFunction, __LINE__}, -failure, "sync of %s failed: %s", bundles.c_str(),
@@ -124,6 +126,12 @@ ZORContainerMigrator::Outcome ZORContainerMigrator::performMigrationWithError() 
 }
 
 bool ZORContainerMigrator::mayHoldBundles(const FileURL& former) {
+    // Another's directory that its owner named so holds none.
+    if (const auto judged = services_.fileManager.openDirectoryOf(firstMobileUserId, former);
+        !judged && judged.error().isPosix(EPERM)) {
+        services_.log.write(logLevelError, migrationFunction, "%s", judged.error().text().c_str());
+        return false;
+    }
     if (services_.fileManager.itemExistsAtURL(former))
         return true;
     // What cannot be examined counts as there: its move fails, no marker is written, and the next boot tries again. A
@@ -135,16 +143,36 @@ bool ZORContainerMigrator::mayHoldBundles(const FileURL& former) {
 
 Result<void> ZORContainerMigrator::moveFormerBundles(const FileURL& former, const FileURL& bundles) {
     const auto present = TRY(services_.fileManager.urlsForItemsInDirectoryAtURL(bundles));
-    // Something lies there already: an earlier migration was cut short, or containers were made before this one.
-    if (!present.empty())
+    // Something lies there already: an earlier migration was cut short, or containers were made before this one. Or
+    // what would come along is not all of the old owner's.
+    if (!present.empty() || holdsOfOthers(former))
         return moveEachFormerBundle(former);
     return services_.fileManager.moveItemAtURL(former, bundles);
+}
+
+bool ZORContainerMigrator::isOfAnother(const FileURL& directory) {
+    const auto judged = services_.fileManager.openDirectoryOf(firstMobileUserId, directory);
+    return !judged && judged.error().isPosix(EPERM);
+}
+
+bool ZORContainerMigrator::holdsOfOthers(const FileURL& former) {
+    const auto items = services_.fileManager.urlsForItemsInDirectoryAtURL(former);
+    if (items && std::ranges::any_of(*items, [this](const FileURL& item) { return isOfAnother(item); }))
+        return true;
+    return std::ranges::any_of(bundleClasses, [this](ContainerClass containerClass) {
+        const auto containers = services_.fileManager.urlsForItemsInDirectoryAtURL(
+            services_.configuration.formerBundleDirectory(containerClass));
+        return containers &&
+               std::ranges::any_of(*containers, [this](const FileURL& container) { return isOfAnother(container); });
+    });
 }
 
 Result<void> ZORContainerMigrator::moveEachFormerBundle(const FileURL& former) {
     std::optional<ZORError> failure;
     for (const ContainerClass containerClass : bundleClasses) {
         const FileURL source = services_.configuration.formerBundleDirectory(containerClass);
+        if (isOfAnother(source))
+            continue;
         const auto containers = services_.fileManager.urlsForItemsInDirectoryAtURL(source);
         // What the user put in a directory's place holds no containers; it goes with what is left.
         if (!containers && (containers.error().isPosix(ENOENT) || isMisshapen(containers.error())))
@@ -156,12 +184,21 @@ Result<void> ZORContainerMigrator::moveEachFormerBundle(const FileURL& former) {
         const auto target =
             services_.configuration.containerDirectoryURLForUser(bundleOwnerUserId, containerClass, false);
         for (const FileURL& container : *containers)
-            if (auto moved = moveFormerBundle(container, target->appendingDirectory(container.lastPathComponent()));
-                !moved)
+            if (isOfAnother(container))
+                continue;
+            else if (auto moved =
+                         moveFormerBundle(container, target->appendingDirectory(container.lastPathComponent()));
+                     !moved)
                 failure = std::move(moved).error();
     }
     if (failure)
         return *failure;
+    if (holdsOfOthers(former)) {
+        services_.log.write(logLevelError, migrationFunction,
+                            "%s stays: something in it belongs to others than user %u; move that away, and remove it",
+                            former.c_str(), firstMobileUserId);
+        return {};
+    }
     // What is left are directories that held containers, and what never was one. It is in nobody's way.
     return services_.sharedClientConnection->_moveItemAtURLToDeathRow(former, StartDeletionThread::no);
 }

@@ -52,6 +52,10 @@ public:
 private:
     [[nodiscard]] bool mayHoldBundles(const FileURL& former);
     Result<void> moveFormerBundles(const FileURL& former, const FileURL& bundles);
+    /// Whether a directory belongs to another than the old owner of bundles.
+    bool isOfAnother(const FileURL& directory);
+    /// Whether the old place's class directories or containers do, all or some.
+    bool holdsOfOthers(const FileURL& former);
     Result<void> moveEachFormerBundle(const FileURL& former);
     Result<void> moveFormerBundle(const FileURL& container, const FileURL& target);
     struct Count {

@@ -109,8 +109,8 @@ TEST_F(FileManager, MovesAcrossFileSystems) {
         GTEST_SKIP() << "skipped: no mount namespace to be had";
 }
 
-// Goal: everything but metadata files gets the owner and 0755 or 0644; what has a name outside keeps its own. Method:
-// one item of each kind, before and after.
+// Goal: everything of the former owner's but metadata files gets the owner and 0755 or 0644; what has a name outside or
+// is another's keeps its own. Method: one item of each kind, before and after.
 TEST_F(FileManager, StandardisesOwnership) {
     if (!isRoot())
         GTEST_SKIP() << "skipped: needs root to give files away";
@@ -127,13 +127,17 @@ TEST_F(FileManager, StandardisesOwnership) {
     makeFile("tree/twice", "x", 04711);
     ASSERT_EQ(::link(path("tree/twice").c_str(), path("tree/sub/twice").c_str()), 0);
     // In a directory that cannot be given away, names may be moved and counted twice.
+    for (int other = 0; other < 102; ++other) {
+        makeFile("tree/other" + std::to_string(other), "x", 0600);
+        ASSERT_EQ(::chown(path("tree/other" + std::to_string(other)).c_str(), 502, 502), 0);
+    }
     failNext(DiskCall::changeOwner, EROFS);
-    ASSERT_TRUE(manager().standardizeOwnershipAtURL(url("tree"), 501, 502));
+    ASSERT_TRUE(manager().standardizeOwnershipAtURL(url("tree"), 501, 502, 0));
     EXPECT_EQ(item("tree/twice").substr(0, 6), "104711");
     lines.take();
-    ASSERT_TRUE(manager().standardizeOwnershipAtURL(url("tree"), 501, 502));
+    ASSERT_TRUE(manager().standardizeOwnershipAtURL(url("tree"), 501, 502, 0));
     EXPECT_EQ(item("tree/twice"), "100755 501:502");
-    ASSERT_TRUE(manager().standardizeOwnershipAtURL(url("tree/shared"), 501, 502));
+    ASSERT_TRUE(manager().standardizeOwnershipAtURL(url("tree/shared"), 501, 502, 0));
     EXPECT_EQ(item("tree"), "040755 501:502");
     EXPECT_EQ(item("tree/sub"), "040755 501:502");
     EXPECT_EQ(item("tree/plain"), "100644 501:502");
@@ -143,13 +147,16 @@ TEST_F(FileManager, StandardisesOwnership) {
     EXPECT_EQ(item("tree/link"), "120777 501:502");
     EXPECT_EQ(item("outside"), "100600 0:0");
     EXPECT_EQ(item("shared"), "100600 0:0");
-    EXPECT_TRUE(lines.take().empty());
+    EXPECT_EQ(item("tree/other0"), "100600 502:502");
+    const auto said = lines.take(); // each of the others, up to a limit, and their number
+    ASSERT_EQ(said.size(), 101U);
+    EXPECT_EQ(said.back().message, "2 more items below " + path("tree") + " keep their owner and mode");
     fail(support::FaultSpan::fromThenOn, DiskCall::changeOwner, EROFS);
-    EXPECT_TRUE(manager().standardizeOwnershipAtURL(url("tree/plain"), 33, 33));
+    EXPECT_TRUE(manager().standardizeOwnershipAtURL(url("tree/plain"), 33, 33, 501));
     disk.disarm();
     EXPECT_TRUE(hasLine(lines.take(), 3, "standardizeOwnershipAtURL",
                         "Could not chown " + path("tree/plain") + ": Read-only file system"));
-    expectPosix(manager().standardizeOwnershipAtURL(url("no"), 501, 501), ENOENT,
+    expectPosix(manager().standardizeOwnershipAtURL(url("no"), 501, 501, 0), ENOENT,
                 "Could not stat " + path("no") + ": No such file or directory");
 }
 

@@ -3,6 +3,7 @@
 // system containers that nobody is entitled to.
 #include "world/World.h"
 
+#include <algorithm>
 #include <gtest/gtest.h>
 #include <stdexcept>
 #include <unistd.h>
@@ -140,6 +141,47 @@ TEST(Migration, BundlesOfAHostileOwner) {
         EXPECT_TRUE(world.exists(bundleMarker));
         EXPECT_EQ(world.item(container + "/program"), before);
     }
+}
+
+// Goal: what lies in the old place and is neither the old owner's nor the installer's stays whose and how it is, keeps
+// nothing else from moving, and is said. Method: a closed directory, of root's and of another user's, by each name.
+TEST(Migration, WhatBelongsToOthersStaysTheirs) {
+    if (::geteuid() != 0)
+        GTEST_SKIP() << "skipped: needs root for directories of several users";
+    struct Row {
+        std::string place;
+        bool othersMove;
+        std::string after; // where it is then
+    };
+    const std::string inside = "/Application/" + firstUuid + "/private";
+    const Row rows[] = {
+        {former, false, former},
+        {former + "/Application", false, former + "/Application"},
+        {former + "/Framework", true, former + "/Framework"},
+        {former + "/Application/" + secondUuid, true, former + "/Application/" + secondUuid},
+        {former + inside, true, bundles + inside},
+    };
+    for (const Row& row : rows)
+        for (const std::uint32_t owner : {0U, second}) {
+            SCOPED_TRACE(row.place);
+            World world;
+            if (row.othersMove)
+                putFormerBundle(world, former + "/Application/" + firstUuid, "a");
+            world.makeDirectories(row.place, owner, 0700);
+            world.write(row.place + "/" + secondUuid + "/secret", "s", 0600);
+            const std::string before = support::readTree(world.path(row.place)).describe();
+            const auto outcome = migrateBundles(world);
+            EXPECT_TRUE(outcome.succeeded && !outcome.error);
+            EXPECT_EQ(outcome.migrated, row.othersMove ? 1U : 0U);
+            EXPECT_TRUE(world.exists(bundleMarker));
+            EXPECT_EQ(world.item(row.after), directoryOf(owner, 0700));
+            EXPECT_EQ(support::readTree(world.path(row.after)).describe(), before);
+            const auto said = world.log.take();
+            EXPECT_TRUE(std::ranges::any_of(said, [](const support::LogLine& line) {
+                return line.message.find(" belongs to ") != std::string::npos;
+            }));
+            EXPECT_TRUE(world.create("com.example.new", ContainerClass::bundleApplication));
+        }
 }
 
 // Goal: a marker that cannot be examined brings no second migration, which would believe the mobile user's metadata.
