@@ -366,8 +366,12 @@ bool ContainerCheck::checkSubdirectory(const Container& container, const Contain
     }
     const std::string fault =
         attributesFault(status, layout.subdirectoryMode, layout.subdirectoryOwner, look_.device().ownersCount());
+    // The daemon gives no directory of another's away; a container's owner may have given it this name.
     if (!fault.empty())
-        describe(look_.add(FindingCode::subdirectoryAttributes, url, fault, Mender::daemon), container);
+        describe(look_.device().ownersCount() && status.st_uid != layout.subdirectoryOwner
+                     ? look_.addForPerson(FindingCode::subdirectoryAttributes, url, fault, look_.moveAside(url))
+                     : look_.add(FindingCode::subdirectoryAttributes, url, fault, Mender::daemon),
+                 container);
     checkProtection(container, subdirectory, item->get());
     return true;
 }

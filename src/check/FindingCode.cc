@@ -46,7 +46,10 @@ constexpr std::array<FindingPage, findingCodeCount> pages = {{
      "its program removed it", "programs that count on it fail", "zorvanectl repair makes it again"},
     {FindingCode::subdirectoryAttributes, "subdirectory-attributes", fault,
      "a standard subdirectory has another owner or mode than the daemon gave it", "its program, or root, changed them",
-     "its user may not reach it, or others may", "zorvanectl repair sets them again"},
+     "its user may not reach it, or others may",
+     "zorvanectl repair sets the mode again; it leaves another's directory as it is: move that aside, with the command "
+     "that "
+     "the check names, and repair the container"},
     {FindingCode::wrongShape, "wrong-shape", fault,
      "there is a link, a file or something else where a directory belongs",
      "a program put it there, perhaps to lead the daemon astray: it follows no link",
@@ -110,8 +113,9 @@ constexpr std::array<FindingPage, findingCodeCount> pages = {{
      "register what was lost (zorvanectl entitlements set), then remove the file: that says that the loss is accepted"},
     {FindingCode::bootMarkerForeign, "boot-marker-foreign", fault, "the boot marker belongs to somebody else",
      "any user can make a file of this name",
-     "it counts as absent: each start of the daemon does the work of a boot again, and discards transient containers",
-     "nothing: the next start of the daemon removes it and makes its own"},
+     "it counts as absent: the next start of the daemon does the work of a boot again, and discards transient "
+     "containers",
+     "nothing: the next start of the daemon makes its own"},
     {FindingCode::bootMarkerMissing, "boot-marker-missing", fault, "the daemon runs, and there is no boot marker",
      "the daemon could not make it, or somebody removed it",
      "the next start of the daemon does the work of a boot again, and discards transient containers",

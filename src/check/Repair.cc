@@ -35,7 +35,7 @@ void addStructureSteps(std::vector<RepairStep>& steps, const std::vector<Finding
     for (const Finding& finding : findings) {
         const bool isStructure =
             finding.code == FindingCode::subdirectoryMissing || finding.code == FindingCode::subdirectoryAttributes;
-        if (!isStructure || !finding.uuid)
+        if (!isStructure || finding.mender != Mender::daemon || !finding.uuid)
             continue;
         if (known.emplace(finding.uuid->string(), finding.identifier, *finding.user, *finding.containerClass).second)
             steps.push_back(structureStep(finding, root));

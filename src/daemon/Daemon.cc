@@ -21,12 +21,7 @@ constexpr LogSize logSize{1, 102'400};
 int Daemon::run() {
     const platform::Platform& platform = composition_.platform();
     auto startUp = platform.transactions.hold();
-    const auto homeWasOpen = composition_.configuration().closeHomeDirectory();
     openLog();
-    if (!homeWasOpen)
-        composition_.log().write(logLevelError, "main", "%s", homeWasOpen.error().text().c_str());
-    else if (*homeWasOpen)
-        composition_.log().write(logLevelNotice, "main", "Closed the daemon's home directory, which others could read");
     if (!startQueues()) {
         composition_.log().write(logLevelError, "main", "Can't create dispatch queues. Exiting.");
         return -1;
@@ -72,6 +67,10 @@ void Daemon::setUp() {
     const auto& client = composition_.sharedClientConnection();
     if (options_.containersPerUser)
         composition_.store().limits.containersMaxPerUser = *options_.containersPerUser;
+    if (const auto homeWasOpen = composition_.configuration().closeHomeDirectory(); !homeWasOpen)
+        log.write(logLevelError, "main", "%s", homeWasOpen.error().text().c_str());
+    else if (*homeWasOpen)
+        log.write(logLevelNotice, "main", "Closed the daemon's home directory, which others could read");
     const platform::BootMarker::State marker = platform.bootMarker.look();
     if (marker.foreign)
         log.write(logLevelError, "main", "Semaphore %s belongs to somebody else; it counts as absent",

@@ -143,10 +143,16 @@ Result<FileDescriptor> ZORFileManager::makeNewDirectory(int base, std::string_vi
                                                         const DirectoryAttributes& attributes) {
     const FileURL parentUrl = url.deletingLastPathComponent();
     const std::size_t slash = relativePath.rfind('/');
-    const std::string above(slash == relativePath.npos ? "." : relativePath.substr(0, slash));
+    const std::string way(slash == relativePath.npos ? "." : relativePath.substr(0, slash));
     const auto parent = intermediates == Intermediates::yes
-                            ? fs::makeDirectories(disk_, base, above, attributes.intermediateMode)
-                            : openBeneath(base, above.c_str(), O_PATH | O_DIRECTORY);
+                            ? fs::makeDirectories(disk_, base, way, attributes.intermediateMode)
+                            : openBeneath(base, way.c_str(), O_PATH | O_DIRECTORY);
+    // Below a user's directory the daemon's own levels are open to all; what is closed, or another's, was named so.
+    struct stat above{};
+    if (parent && base != resolver_.root().descriptor() && ::fstat(parent->get(), &above) == 0 &&
+        above.st_uid != ownerToBe(attributes.owner) && (above.st_uid != daemon_ || (above.st_mode & S_IXOTH) == 0))
+        return posixError(ZOR_HERE, EPERM, "%s belongs to user %u, so nothing is made in it; move it away",
+                          parentUrl.c_str(), above.st_uid);
     const std::string finalName(url.lastPathComponent());
     std::string name;
     int made = parent ? -EEXIST : -parent.error();

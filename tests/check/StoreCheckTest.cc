@@ -276,6 +276,7 @@ TEST(StoreCheckTest, FindsWhatChangedItsOwner) {
     const auto findings = store.check();
     ASSERT_EQ(findings.size(), 2U) << textOf(findings);
     EXPECT_EQ(findings[0].code, FindingCode::subdirectoryAttributes);
+    EXPECT_EQ(findings[0].mender, Mender::person); // the daemon gives nothing of another's away
     EXPECT_EQ(findings[1].code, FindingCode::containerAttributes);
     EXPECT_NE(findings[1].command.find("chown 501:501 . && chmod 0755 ."), std::string::npos);
 }

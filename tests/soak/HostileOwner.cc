@@ -3,8 +3,13 @@
 
 #include "support/FileTree.h"
 
+#include <array>
+#include <cstdio>
+#include <fcntl.h>
 #include <filesystem>
+#include <stdexcept>
 #include <sys/stat.h>
+#include <unistd.h>
 
 namespace zor::soak {
 
@@ -13,6 +18,11 @@ namespace {
 namespace files = std::filesystem;
 
 using whole::dataApplication;
+
+/// Whose directories get wanted names.
+constexpr std::array<uid_t, 2> owners = {0, 501};
+/// So many of the victims, the first ones, lead to containers; the daemon moves the others about itself.
+constexpr std::size_t placesOnTheWay = 3;
 
 /// Where the second user's containers lie and what leads there, at every depth.
 std::vector<std::string> victimsBelow(const std::string& home) {
@@ -35,6 +45,13 @@ HostileOwner::HostileOwner(Session& session, std::uint64_t seed)
     files::create_directories(outside_ + "/Data/Application/tmp");
     whole::writeFile(outside_ + "/file", "untouched");
     whole::writeFile(outside_ + "/Data/Application/" + whole::metadataFile, "untouched");
+    for (const uid_t owner : owners) {
+        const std::string closed = closedOf(owner);
+        files::create_directories(closed + "/Data/sub");
+        whole::writeFile(closed + "/secret", "untouched");
+        if (::chmod(closed.c_str(), 0700) != 0 || (::geteuid() == 0 && ::chown(closed.c_str(), owner, owner) != 0))
+            throw std::runtime_error("cannot close " + closed);
+    }
     before_ = support::readTree(outside_).describe();
 }
 
@@ -94,6 +111,21 @@ void HostileOwner::ask() {
     }
 }
 
+std::string HostileOwner::closedOf(uid_t owner) const {
+    return outside_ + "/closed-" + std::to_string(owner);
+}
+
+void HostileOwner::nameAnothersSo(const std::string& victim) {
+    std::error_code error;
+    const std::string closed = closedOf(owners[swapping_.upTo(owners.size())]);
+    if (::geteuid() != 0 || files::canonical(victim, error) != victim ||
+        ::renameat2(AT_FDCWD, closed.c_str(), AT_FDCWD, victim.c_str(), RENAME_EXCHANGE) != 0)
+        return;
+    std::this_thread::sleep_for(std::chrono::microseconds(swapping_.upTo(3000)));
+    if (::renameat2(AT_FDCWD, closed.c_str(), AT_FDCWD, victim.c_str(), RENAME_EXCHANGE) != 0)
+        session_.found("another's directory is gone from " + victim);
+}
+
 void HostileOwner::swapOnce(const std::string& victim) {
     std::error_code error;
     // Not through a link that it put there itself: this thread may change what lies outside.
@@ -128,6 +160,7 @@ void HostileOwner::swap() {
         const auto victims = victimsBelow(session_.root() + "/" + hostileHome);
         for (unsigned i = 0; i < 8 && !session_.stopped; ++i)
             swapOnce(victims[swapping_.upTo(victims.size())]);
+        nameAnothersSo(victims[swapping_.upTo(placesOnTheWay)]);
         sleepMilliseconds(1);
     }
 }

@@ -1,10 +1,12 @@
 // SPDX-License-Identifier: Apache-2.0
-// The second user: a client that asks for containers of its own, and meanwhile puts links and pipes in the places of
-// what the daemon works on, so that it would change what lies outside. Any answer will do, as long as there is one;
-// what lies outside stays as it is.
+// The second user: a client that asks for containers of its own, and meanwhile puts links, pipes and closed directories
+// of others in the places of what the daemon works on, so that it would change what lies outside or is another's. Any
+// answer will do, as long as there is one; what lies outside, or is another's, stays as it is.
 #pragma once
 
 #include "soak/Session.h"
+
+#include <sys/types.h>
 
 namespace zor::soak {
 
@@ -24,6 +26,10 @@ public:
 private:
     zorvane::Result<void> askOnce(zorvane::Client& client);
     void swapOnce(const std::string& victim);
+    /// A closed directory of this user's.
+    [[nodiscard]] std::string closedOf(uid_t owner) const;
+    /// For a moment another's closed directory has the place's name.
+    void nameAnothersSo(const std::string& victim);
 
     Session& session_;
     Choices asking_;

@@ -4,8 +4,11 @@
 #include "daemon/Options.h"
 #include "world/World.h"
 
+#include <algorithm>
+#include <filesystem>
 #include <future>
 #include <gtest/gtest.h>
+#include <unistd.h>
 
 namespace zor::test {
 namespace {
@@ -56,6 +59,38 @@ TEST(DaemonLife, TheWorkOfABootRunsOnce) {
                 said.push_back(std::move(line));
         EXPECT_EQ(said, row.said);
         EXPECT_EQ(world.bootMarker.state.present, row.makeError == 0);
+    }
+}
+
+// Goal: nobody else reads what is staged or deleted. Method: the home of the daemon's directories missing, open,
+// closed, and another's, which stays so and is said, before a launch.
+TEST(DaemonLife, ClosesItsHome) {
+    struct Row {
+        std::uint32_t owner;
+        mode_t before;
+        mode_t after;
+        int said; // the level; 0: nothing
+    };
+    const std::string home = "private/var/root";
+    for (const auto& [owner, before, after, said] :
+         {Row{0, 0, 0700, 0}, Row{0, 0755, 0700, 5}, Row{0, 0710, 0700, 5}, Row{0, 0700, 0700, 0},
+          Row{second, 0755, 0755, 3}, Row{second, 0700, 0700, 0}}) {
+        if (owner != 0 && ::geteuid() != 0)
+            continue; // another's cannot be made
+        SCOPED_TRACE(before);
+        World world;
+        if (before == 0)
+            std::filesystem::remove_all(world.path(home));
+        else
+            world.makeDirectories(home, owner, before);
+        world.bootMarker.state.present = true;
+        world.services().configuration().logDirectory();
+        world.log.take();
+        Daemon(world.services(), {}).setUp();
+        EXPECT_EQ(world.item(home), directoryOf(owner, after));
+        const auto lines = world.log.take();
+        const auto line = std::ranges::find_if(lines, [](const LogLine& one) { return one.function == "main"; });
+        EXPECT_EQ(line == lines.end() ? 0 : line->level, said);
     }
 }
 

@@ -88,6 +88,8 @@ TEST(WantedName, GivesNothingAway) {
     const Row rows[] = {
         {"base", 0, mobileContainers, creating(false), notMoved},
         {"base at boot", 0, mobileContainers, booting},
+        {"on the way", second, std::string(mobileContainers) + "/Data", creating(false), notMoved},
+        {"on the way, of root's", 0, std::string(mobileContainers) + "/Data", creating(false), notMoved},
         {"class", second, applications, creating(false), notMoved},
         {"class of root's", 0, applications, creating(false), notMoved},
         {"class at boot", second, applications, booting},
