@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // The one-line form of a value. Its text often comes from clients, so nothing in it can end a log line or fill the log:
-// control characters are escaped, and the work stops where the text is full.
+// what must not be shown is escaped, and the work stops where the text is full.
+#include "plist/EscapedText.h"
 #include "plist/Limits.h"
 #include "plist/Utf8.h"
 #include "plist/Value.h"
@@ -13,11 +14,6 @@ namespace {
 
 constexpr std::string_view cutMark = "...";
 constexpr char hexDigits[] = "0123456789abcdef";
-
-/// What ends a line or turns a terminal's mind: C0, DEL, C1, the two line separators of Unicode.
-bool isControl(char32_t c) {
-    return c < 0x20 || (c >= 0x7F && c < 0xA0) || c == 0x2028 || c == 0x2029;
-}
 
 class Describer {
 public:
@@ -48,9 +44,10 @@ void Describer::character(std::string_view bytes, char32_t codePoint, Quoted quo
         out_ += bytes;
     } else if (codePoint == '\n') {
         out_ += "\\n";
-    } else if (isControl(codePoint)) {
-        out_ += "\\u";
-        for (int shift = 12; shift >= 0; shift -= 4)
+    } else if (!isShown(codePoint)) {
+        const bool isShort = codePoint <= 0xFFFF;
+        out_ += isShort ? "\\u" : "\\U";
+        for (int shift = isShort ? 12 : 28; shift >= 0; shift -= 4)
             out_ += hexDigits[(codePoint >> shift) & 0xFU];
     } else {
         out_ += bytes;

@@ -33,13 +33,6 @@ constexpr Range notShown[] = {
     {0xE0000, 0xE0FFF},                                       // tags, more variation selectors
 };
 
-bool isShown(char32_t character) {
-    if (character >= 0x20 && character < 0x7F)
-        return true;
-    return std::ranges::none_of(
-        notShown, [character](const Range& range) { return character >= range.first && character <= range.last; });
-}
-
 void appendHex(std::string& line, unsigned char byte) {
     line += "\\x";
     line += hexDigits[byte >> 4];
@@ -47,6 +40,13 @@ void appendHex(std::string& line, unsigned char byte) {
 }
 
 } // namespace
+
+bool isShown(char32_t character) {
+    if (character >= 0x20 && character < 0x7F)
+        return true;
+    return std::ranges::none_of(
+        notShown, [character](const Range& range) { return character >= range.first && character <= range.last; });
+}
 
 void appendEscaped(std::string& line, std::string_view text, Tabs tabs) {
     for (std::size_t i = 0; i < text.size();) {

@@ -9,6 +9,10 @@
 
 namespace zor::plist {
 
+/// Whether a character may be shown as it is: no control character (a tab is one), none that turns the direction of
+/// writing, ends a line or is not seen. Every escaping of text asks here.
+[[nodiscard]] bool isShown(char32_t character);
+
 /// A tab steers no terminal, but it can move a column of a table, or stand for its end.
 enum class Tabs : std::uint8_t { stay, escaped };
 

@@ -47,4 +47,10 @@ TEST(Value, TypedReads) {
     EXPECT_EQ(entries.string("missing"), nullptr);
 }
 
+// A description neither turns the direction of writing, nor ends a line, nor hides a character.
+TEST(Value, DescriptionsShowWhatIsThere) {
+    const Value text("a\tb\u202Ec\u2028d\U000E0041\xff\n");
+    EXPECT_EQ(describe(&text), "a\\u0009b\\u202ec\\u2028d\\U000e0041\\xff\\n");
+}
+
 } // namespace zor::plist::test
