@@ -110,8 +110,10 @@ constexpr Row rows[] = {
     {41, {"the container could not be moved to death row", diskFailed, "it is where it was", seeDisk}},
     {43,
      {"the containers of this class could not be read",
-      "the class directory cannot be listed, or the user may not own containers of the class",
-      "no container of the class is found until it can be read", "the daemon's log says which directory and why"}},
+      "the user's home is not there or is locked, the class directory cannot be listed, or the user may not own "
+      "containers of the class",
+      "no container of the class is found until it can be read; nothing was changed",
+      "mount or unlock the home and ask again; the daemon's log says which directory and why"}},
     {44,
      {"the container has lost its metadata file", "somebody removed it while the daemon ran",
       "the container cannot be used; the next boot deletes it",

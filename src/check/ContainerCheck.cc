@@ -142,8 +142,9 @@ void ContainerCheck::checkClass(ContainerClass containerClass, std::uint32_t use
 }
 
 void ContainerCheck::checkDirectory(ClassDirectory& directory) {
-    const MetadataReader reader(directory.descriptor, std::make_shared<const std::string>(directory.url.path()),
-                                directory.user, CheckClassPath::yes);
+    const MetadataReader reader(look_.device().fileManager().disk(), directory.descriptor,
+                                std::make_shared<const std::string>(directory.url.path()), directory.user,
+                                CheckClassPath::yes);
     look_.forEachName(directory.descriptor, directory.url, [&](const char* name) {
         if (name[0] == '.')
             checkHidden(directory.url, name);
@@ -208,6 +209,11 @@ std::shared_ptr<ZORMetadata> ContainerCheck::readRecord(const ClassDirectory& di
     auto read = reader.judge(name);
     if (read)
         return std::move(*read);
+    // Whose it is nobody can tell while the key of its encryption is away: it may well be whole.
+    if (const ZORError* cause = read.error().error.underlying(); cause && cause->isPosix(ENOKEY)) {
+        look_.addUnexamined(directory.url.appendingDirectory(name), ENOKEY).user = directory.user;
+        return nullptr;
+    }
     struct stat status{};
     if (::fstatat(container, names::metadataFile, &status, AT_SYMLINK_NOFOLLOW) != 0 && errno == ENOENT) {
         // One that has gone altogether was read a moment too late.
@@ -251,7 +257,8 @@ std::optional<FileURL> ContainerCheck::rightPlace(const ClassDirectory& director
     owners.push_back({systemOwnerUserId, {}});
     const auto parent = std::make_shared<const std::string>(directory.url.path());
     for (const auto& [userId, home] : owners) {
-        const MetadataReader reader(directory.descriptor, parent, userId, CheckClassPath::no);
+        const MetadataReader reader(look_.device().fileManager().disk(), directory.descriptor, parent, userId,
+                                    CheckClassPath::no);
         const auto record = reader.read(name);
         if (!record || !userIdIsValidForClass((*record)->containerClass(), userId))
             continue;

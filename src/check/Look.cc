@@ -3,9 +3,10 @@
 
 #include "daemon/base/UserIdentity.h"
 #include "fs/BulkDirectoryRead.h"
+#include "fs/Hidden.h"
 #include "platform/linux/Names.h"
 #include "store/Names.h"
-#include "store/ZORPerUserConfiguration.h"
+#include "store/UserHome.h"
 
 #include <cerrno>
 #include <sys/stat.h>
@@ -19,10 +20,14 @@ Look::Look(CheckedSystem& system, const CheckOptions& options)
 }
 
 void Look::addUser(std::uint32_t userId) {
-    auto home = ZORPerUserConfiguration::homeOf(system_.passwords(), userId);
-    const FileURL looked = home ? *home : FileURL::file(system_.root().path(platform::names::passwordFile));
+    const auto entry = system_.passwords().entryForUserId(userId);
+    auto home = UserHome::pathOf(system_.passwords(), userId);
+    const FileURL looked = entry ? FileURL::directory(home ? home->path() : entry->homeDirectory)
+                                 : FileURL::file(system_.root().path(platform::names::passwordFile));
     struct stat status{};
     const int error = home ? system_.fileManager().resolver().status(*home, status) : home.error();
+    if (error == ENOENT && entry)
+        homeless_.insert(userId);
     if (error == 0)
         users_.push_back({userId, std::move(*home)});
     else if (error != ENOENT)
@@ -69,8 +74,18 @@ void Look::addWrongShape(const FileURL& url) {
     }
 }
 
+bool Look::isHidden(const FileURL& url) {
+    ZORFileManager& fileManager = system_.fileManager();
+    const auto hider = fs::hiddenBy(fileManager.resolver(), fileManager.disk(), url);
+    if (hider && hiding_.insert(hider->path()).second)
+        addUnexamined(*hider, ENOKEY);
+    return hider.has_value();
+}
+
 std::optional<platform::FileDescriptor> Look::openDirectory(const FileURL& url) {
     auto opened = system_.fileManager().resolver().openDirectory(url);
+    if ((opened || opened.error() == ENOENT) && isHidden(url))
+        return std::nullopt;
     if (opened)
         return std::move(*opened);
     if (opened.error() == ELOOP || opened.error() == ENOTDIR)

@@ -36,13 +36,17 @@ public:
     /// Those that have a home, so far as it can be looked at.
     [[nodiscard]] const std::vector<MobileUser>& users() const { return users_; }
 
+    /// Whether it is an account of a mobile user whose home is not there now.
+    [[nodiscard]] bool lacksHome(std::uint32_t userId) const { return homeless_.contains(userId); }
+
     /// Adds a finding and gives it for more to be filled in. `url` is what it is about.
     Finding& add(FindingCode code, const FileURL& url, std::string what, Mender mender);
     /// A finding that somebody who may use a shell can mend.
     Finding& addForPerson(FindingCode code, const FileURL& url, std::string what, std::string command);
     Finding& addUnexamined(const FileURL& url, int error);
 
-    /// An open directory; nothing when there is none, or when there is something else, which is then a finding.
+    /// An open directory; nothing when there is none, or when there is something else, or an encryption hides it, which
+    /// is then a finding.
     [[nodiscard]] std::optional<platform::FileDescriptor> openDirectory(const FileURL& url);
     /// Each name in an open directory but "." and "..".
     void forEachName(int directory, const FileURL& url, const std::function<void(const char* name)>& function);
@@ -57,14 +61,18 @@ public:
 
 private:
     void addUser(std::uint32_t userId);
+    /// Whether an encryption hides what is in the directory, or the directory; said once of what hides it.
+    bool isHidden(const FileURL& url);
     void addWrongShape(const FileURL& url);
 
     CheckedSystem& system_;
     const CheckOptions& options_;
     const ZORWhitelist whitelist_;
     std::vector<MobileUser> users_;
+    std::set<std::uint32_t> homeless_;
     std::vector<Finding> findings_;
     std::set<std::string> misshapen_;
+    std::set<std::string> hiding_;
 };
 
 } // namespace zor::check

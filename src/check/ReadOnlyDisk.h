@@ -1,8 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
-// A disk that cannot be changed: every call fails with EROFS, whatever a reader that shares code with the daemon does.
+// A disk that cannot be changed: every call that would fails with EROFS, whatever a reader that shares code with the
+// daemon does.
 #pragma once
 
 #include "platform/Disk.h"
+#include "platform/linux/HiddenNames.h"
 
 #include <cerrno>
 
@@ -29,6 +31,7 @@ public:
     int sync(int) override { return -EROFS; }
     int syncFileSystem(int) override { return -EROFS; }
     int orderData(int) override { return -EROFS; }
+    [[nodiscard]] bool hidesNames(int directory) override { return platform::hidesNames(directory); }
 };
 
 } // namespace zor::check

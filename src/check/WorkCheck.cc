@@ -9,7 +9,6 @@
 #include "platform/linux/SandboxLinks.h"
 #include "store/operations/ReplaceJournal.h"
 
-#include <charconv>
 #include <ctime>
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -116,6 +115,7 @@ void WorkCheck::checkMappings() {
     const FileURL sandbox = FileURL::directory(root.path(platform::names::runtimeDirectory))
                                 .appendingDirectory(platform::names::sandboxDirectory);
     platform::forEachSandboxDirectory(root, [&](const platform::SandboxDirectory& directory) {
+        const auto user = directory.userId();
         const FileURL url = sandbox.appendingDirectory(directory.user).appendingDirectory(directory.itemType);
         for (const std::string& name : platform::directoryNamesIfAny(directory.descriptor)) {
             if (platform::isSandboxLeftover(name)) {
@@ -123,15 +123,16 @@ void WorkCheck::checkMappings() {
                           "is a sandbox mapping whose making was cut short", Mender::launch);
                 continue;
             }
-            if (!platform::isDanglingSandboxLink(root, directory.descriptor, name.c_str()))
+            // A home that is not there comes back with its containers.
+            if ((user && look_.lacksHome(*user)) ||
+                !platform::isDanglingSandboxLink(root, look_.device().fileManager().disk(), directory.descriptor,
+                                                 name.c_str()))
                 continue;
             Finding& finding = look_.add(FindingCode::mappingDangling, url.appendingFile(name),
                                          "is a sandbox mapping that leads to no container", Mender::launch);
             finding.identifier = platform::percentDecode(name).value_or("");
-            std::uint32_t user = 0;
-            const std::string& text = directory.user;
-            if (std::from_chars(text.data(), text.data() + text.size(), user).ec == std::errc())
-                finding.user = user;
+            if (user)
+                finding.user = *user;
         }
     });
 }

@@ -222,8 +222,9 @@ private:
     /// Error 38 when the user of the container has as many as one may have.
     Result<void> checkShare(std::uint32_t userId, const std::string& identifier);
     Result<void> discardTransient(const ZORMetadata& record, const std::string& identifier);
+    /// `homeGeneration`: of the home in which the container was looked for and not found.
     Result<FoundContainer> create(std::uint32_t userId, const std::string& identifier, ContainerClass containerClass,
-                                  bool transient);
+                                  bool transient, std::uint64_t homeGeneration);
     Result<void> checkRequest(std::uint32_t userId, const std::string* identifier, ContainerClass containerClass);
     ZORError cleanUpStaging(const FileURL& staging, ZORError error);
 
@@ -283,6 +284,9 @@ private:
     /// Names in staging that journals on the disk still speak of; nullopt when it cannot be told which there are.
     std::optional<std::set<std::string, std::less<>>> stagedByJournals();
     std::size_t journalCount();
+    /// Whether what is not found of a user's containers has gone: the user's home is there, and holds the place of
+    /// them.
+    bool showsContainers(std::uint32_t userId);
     void makeDirectoriesDurable();
 
     StoreServices& services_;

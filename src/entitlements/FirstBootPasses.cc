@@ -24,6 +24,16 @@ constexpr const char* reconcileFunction = "reconcileSystemContainers";
 constexpr std::array formerGroupHolders = {ContainerClass::dataApplication, ContainerClass::dataKolvexPlugin,
                                            ContainerClass::dataVPNPlugin};
 
+/// One with an account whose home is not there, or cannot be looked for.
+std::optional<std::uint32_t> userWithoutHome(const ZORGlobalConfiguration& configuration) {
+    for (std::uint32_t userId = firstMobileUserId; userId <= lastMobileUserId; ++userId) {
+        const auto state = configuration.homeOf(userId)->look().state;
+        if (state == UserHome::State::missing || state == UserHome::State::unknown)
+            return userId;
+    }
+    return std::nullopt;
+}
+
 const plist::Value* groupIdentifiersIn(const ZORMetadata& container) {
     return container.info() ? container.info()->find(ipc::infoKeys::groupContainerIds) : nullptr;
 }
@@ -60,17 +70,20 @@ std::uint64_t ZOREntitlementMapping::migrateAppGroupIdsFromDataContainersToFile(
     if (errors != 0)
         log_.write(logLevelError, migrateFunction,
                    "Not writing the migration complete file because there we had %d error(s)", errors);
+    else if (const auto absent = userWithoutHome(configuration_))
+        log_.write(logLevelError, migrateFunction,
+                   "Not writing the migration complete file: the home of user %u is not there", *absent);
     else
         services_.migrator.writeMigrationFileToDiskWithName(names::groupIdMigrationMarker);
+    groupIdsAreMigrated_ = errors == 0;
     return migrated;
 }
 
 bool ZOREntitlementMapping::groupIdsAreMigrated() {
-    if (services_.migrator.existsMigrationFileWithName(names::groupIdMigrationMarker))
+    if (groupIdsAreMigrated_ || services_.migrator.existsMigrationFileWithName(names::groupIdMigrationMarker))
         return true;
     // Where that user is not, the lists can never be fetched, and there is never a marker.
-    ZORPerUserConfiguration* user = configuration_.getPerUserConfigurationForUserId(firstMobileUserId);
-    return user && user->isKnownToHaveNoHome();
+    return configuration_.homeOf(firstMobileUserId)->look().state == UserHome::State::noAccount;
 }
 
 bool ZOREntitlementMapping::migrateGroupIdentifiers(const ZORMetadata& container) {

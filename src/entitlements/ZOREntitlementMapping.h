@@ -80,8 +80,8 @@ public:
     // over. Both give the number of containers that they changed.
     /// Moves the group identifiers that older systems kept in data containers into the map; once for the device.
     std::uint64_t migrateAppGroupIdsFromDataContainersToFile() ZOR_EXCLUDES(entitlementQueue_);
-    /// Whether that has been done, or there is nobody for whom it would have to be. As long as not, groups may be in
-    /// use that the map does not mention. Asked of the disk each time; enters no queue.
+    /// Whether that has been done, at this boot at the latest, or there is nobody for whom it would have to be. As long
+    /// as not, groups may be in use that the map does not mention. Asked of the disk each time; enters no queue.
     [[nodiscard]] bool groupIdsAreMigrated();
     /// Stages system containers that no identifier is entitled to for deletion.
     std::uint64_t reconcileSystemContainers() ZOR_EXCLUDES(entitlementQueue_);
@@ -158,6 +158,8 @@ private:
     const FileURL unreadableFileUrl_;
     /// The file that could not be read had its name still when that was last looked at. Set while the map is loaded.
     std::atomic<bool> fileIsUnread_{false};
+    /// This process has done the migration, whether or not it could be marked as done.
+    std::atomic<bool> groupIdsAreMigrated_{false};
     platform::Mutex entitlementQueue_;
     plist::Dictionary entitlementMappingDict_ ZOR_GUARDED_BY(entitlementQueue_);
     /// The last save failed: the map is ahead of the file, and no change may be answered with success before one

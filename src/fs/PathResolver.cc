@@ -6,10 +6,20 @@
 #include <algorithm>
 #include <cerrno>
 #include <fcntl.h>
+#include <sys/sysmacros.h>
 
 namespace zor::fs {
 
 using platform::openBeneath;
+
+std::expected<DirectoryId, int> directoryIdOf(int directory) {
+    struct statx status{};
+    if (::statx(directory, "", AT_EMPTY_PATH | AT_STATX_DONT_SYNC, STATX_INO | STATX_MNT_ID, &status) != 0)
+        return std::unexpected(errno);
+    return DirectoryId{.device = makedev(status.stx_dev_major, status.stx_dev_minor),
+                       .inode = status.stx_ino,
+                       .mount = status.stx_mnt_id};
+}
 
 const char* PathResolver::relative(const FileURL& url) const {
     const std::string& root = root_.canonicalPath();

@@ -12,6 +12,7 @@
 #include "platform/FileDescriptor.h"
 #include "platform/linux/SystemRoot.h"
 
+#include <cstdint>
 #include <expected>
 #include <string>
 #include <string_view>
@@ -27,6 +28,16 @@ struct ParentAndName {
     FileDescriptor directory; // O_PATH
     std::string name;
 };
+
+/// Which directory it is, and of which mount: what lies at its path has changed when this has.
+struct DirectoryId {
+    std::uint64_t device = 0;
+    std::uint64_t inode = 0;
+    std::uint64_t mount = 0;
+    bool operator==(const DirectoryId&) const = default;
+};
+/// Asks no server that keeps the file system. An errno.
+[[nodiscard]] std::expected<DirectoryId, int> directoryIdOf(int directory);
 
 class PathResolver {
 public:

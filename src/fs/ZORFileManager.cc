@@ -4,6 +4,7 @@
 
 #include "fs/AtomicFile.h"
 #include "fs/FreshDirectory.h"
+#include "fs/Hidden.h"
 #include "platform/linux/Openat2.h"
 
 #include <cerrno>
@@ -250,17 +251,23 @@ bool ZORFileManager::itemExistsAtURL(const FileURL& url) {
 bool ZORFileManager::itemDoesNotExistAtURL(const FileURL& url) {
     struct stat status{};
     const int failure = resolver_.status(url, status);
-    if (failure != 0 && failure != ENOENT)
-        log_.write(logLevelError, __func__, "Failed to determine if %s exists: %s", url.c_str(), errorText(failure));
-    return failure == ENOENT;
+    const bool hidden = failure == ENOENT && fs::hiddenBy(resolver_, disk_, url);
+    if (failure != 0 && (failure != ENOENT || hidden))
+        log_.write(logLevelError, __func__, "Failed to determine if %s exists: %s", url.c_str(),
+                   errorText(hidden ? ENOKEY : failure));
+    return failure == ENOENT && !hidden;
 }
 
 bool ZORFileManager::itemDoesNotExistBelow(int directory, const char* relativePath, const FileURL& url) {
     const auto item = openBeneath(directory, relativePath, O_PATH | O_NOFOLLOW);
-    if (!item && item.error() != ENOENT)
-        log_.write(logLevelError, __func__, "Failed to determine if %s exists: %s", url.c_str(),
-                   errorText(item.error()));
-    return !item && item.error() == ENOENT;
+    int failure = item ? 0 : item.error();
+    const std::string_view path = relativePath;
+    if (failure == ENOENT &&
+        fs::hidesNamesBelow(disk_, directory, path.contains('/') ? std::string(path, 0, path.rfind('/')).c_str() : "."))
+        failure = ENOKEY;
+    if (failure != 0 && failure != ENOENT)
+        log_.write(logLevelError, __func__, "Failed to determine if %s exists: %s", url.c_str(), errorText(failure));
+    return failure == ENOENT;
 }
 
 Result<int> ZORFileManager::dataProtectionClassOfItemAtURL(const FileURL& url) {
@@ -288,8 +295,10 @@ Result<void> ZORFileManager::setDataProtectionClassOfEntry(
     if (entry.directory >= 0)
         return setClassOf(entry.directory, path, protectionClass,
                           [&](int current) { return predicate(entry.status, current); });
-    const auto item =
-        platform::openBeneathOnMount(entry.parent, entry.name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
+    auto item = platform::openBeneathOnMount(entry.parent, entry.name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
+    // Its class is beside its content, which alone is encrypted: it needs no key.
+    if (!item && item.error() == ENOKEY)
+        item = platform::openBeneathOnMount(entry.parent, entry.name, O_PATH | O_NOFOLLOW);
     // Gone, a link, something without a reader, or the place of a mount.
     if (!item && (item.error() == ENOENT || item.error() == ELOOP || item.error() == ENXIO || item.error() == EXDEV))
         return {};

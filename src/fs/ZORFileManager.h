@@ -100,7 +100,7 @@ public:
     /// the tree; that and what is the new one's becomes 0755, for directories and what has an execute bit, else 0644.
     /// Anybody else's keeps owner and mode, and is said.
     Result<void> standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid, uid_t formerOwner);
-    /// The entries whose names do not begin with ".", in the directory's order.
+    /// The entries whose names do not begin with ".", in the directory's order. ENOKEY where an encryption hides them.
     Result<std::vector<FileURL>> urlsForItemsInDirectoryAtURL(const FileURL& directory);
     /// What moves across file systems that were cut short left in a directory. Empty when it cannot be read.
     std::vector<FileURL> copyLeftoversInDirectoryAtURL(const FileURL& directory);
@@ -113,7 +113,7 @@ public:
     /// The same of a directory that was opened before; `url` is its name in messages.
     [[nodiscard]] fs::Usage diskUsageOfDirectory(const fs::OpenResult& directory, const FileURL& url);
 
-    // Existence. An item that cannot be examined neither exists nor does not exist.
+    // Existence. An item that cannot be examined, or that an encryption hides, neither exists nor does not exist.
     [[nodiscard]] bool itemExistsAtURL(const FileURL& url);
     [[nodiscard]] bool itemDoesNotExistAtURL(const FileURL& url);
     /// The same of an item below a directory that is open, for who asks of very many; `url` names it in messages.

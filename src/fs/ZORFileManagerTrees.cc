@@ -3,6 +3,7 @@
 #include "fs/AtomicFile.h"
 #include "fs/BulkDirectoryRead.h"
 #include "fs/DiskUsage.h"
+#include "fs/Hidden.h"
 #include "fs/LeftoverNames.h"
 #include "fs/MetadataFileName.h"
 #include "fs/NamesMet.h"
@@ -114,6 +115,8 @@ Result<bool> ZORFileManager::sourceIsMissing(const FileURL& source) {
     const int failure = resolver_.status(source, status);
     if (failure != 0 && failure != ENOENT)
         return posixError(ZOR_HERE, failure, "stat of %s failed: %s", source.c_str(), errorText(failure));
+    if (failure == ENOENT && fs::hiddenBy(resolver_, disk_, source))
+        return posixError(ZOR_HERE, ENOKEY, "stat of %s failed: %s", source.c_str(), errorText(ENOKEY));
     return failure == ENOENT;
 }
 
@@ -304,10 +307,13 @@ Result<std::vector<FileURL>> ZORFileManager::urlsForItemsInDirectoryAtURL(const 
                           directory.c_str(), errorText(number));
     };
     const auto opened = resolver_.openDirectory(directory);
-    if (!opened) {
-        if (opened.error() != ENOENT)
-            log_.write(logLevelError, label, "opendir of %s failed: %s", directory.c_str(), errorText(opened.error()));
-        return failed(opened.error());
+    const bool hidden = opened ? disk_.hidesNames(opened->get())
+                               : opened.error() == ENOENT && fs::hiddenBy(resolver_, disk_, directory);
+    if (!opened || hidden) {
+        const int number = hidden ? ENOKEY : opened.error();
+        if (number != ENOENT)
+            log_.write(logLevelError, label, "opendir of %s failed: %s", directory.c_str(), errorText(number));
+        return failed(number);
     }
     std::vector<FileURL> urls;
     fs::BulkDirectoryRead::Buffer buffer;

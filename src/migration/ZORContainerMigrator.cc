@@ -5,6 +5,7 @@
 #include "daemon/base/UserIdentity.h"
 #include "entitlements/ZORWhitelist.h"
 #include "fs/DictionaryFile.h"
+#include "fs/Hidden.h"
 #include "store/Names.h"
 #include "store/StoreServices.h"
 
@@ -86,6 +87,8 @@ ZORContainerMigrator::Outcome ZORContainerMigrator::performMigrationWithError() 
     const FileURL bundles = services_.configuration.bundleDirectory();
     if (!isDue(names::bundleMigrationMarker))
         return {};
+    if (auto hidden = cannotLook(former))
+        return {.succeeded = false, .error = std::move(hidden)};
     if (mayHoldBundles(former)) {
         log.write(logLevelNotice, migrationFunction, "Moving bundle containers from user to system location");
         if (auto moved = moveFormerBundles(former, bundles); !moved) {
@@ -123,6 +126,20 @@ ZORContainerMigrator::Outcome ZORContainerMigrator::performMigrationWithError() 
     log.write(logLevelNotice, migrationFunction, "Successful bundle migration. Writing marker file.");
     writeMigrationFileToDiskWithName(names::bundleMigrationMarker);
     return {.succeeded = true, .error = std::move(count.last), .migrated = count.migrated};
+}
+
+std::optional<ZORError> ZORContainerMigrator::cannotLook(const FileURL& former) {
+    struct stat status{};
+    const fs::PathResolver& resolver = services_.fileManager.resolver();
+    if (resolver.status(former, status) != ENOENT)
+        return std::nullopt;
+    const auto hider = fs::hiddenBy(resolver, services_.fileManager.disk(), former);
+    if (hider)
+        return posixError({migrationFunction, __LINE__}, ENOKEY, "An encryption whose key is away hides what is in %s",
+                          hider->c_str());
+    if (services_.configuration.homeOf(firstMobileUserId)->look().state == UserHome::State::missing)
+        return posixError({migrationFunction, __LINE__}, ENOENT, "The home of user %u is not there", firstMobileUserId);
+    return std::nullopt;
 }
 
 bool ZORContainerMigrator::mayHoldBundles(const FileURL& former) {

@@ -50,6 +50,9 @@ public:
     Outcome performWhitelistMigrationWithError();
 
 private:
+    /// Why nothing may be concluded from the old place's not being there: its home is not, or an encryption hides it.
+    /// Nothing is done then, and the next boot looks again.
+    [[nodiscard]] std::optional<ZORError> cannotLook(const FileURL& former);
     [[nodiscard]] bool mayHoldBundles(const FileURL& former);
     Result<void> moveFormerBundles(const FileURL& former, const FileURL& bundles);
     /// Whether a directory belongs to another than the old owner of bundles.

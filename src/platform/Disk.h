@@ -34,7 +34,7 @@ public:
     virtual int unlinkFile(int directory, const char* name) = 0;
     virtual int removeDirectory(int directory, const char* name) = 0;
 
-    // Inodes. `fd` may be an O_PATH descriptor for changeMode and changeOwner.
+    // Inodes. `fd` may be an O_PATH descriptor for changeMode, changeOwner and setAttribute.
     virtual int changeMode(int fd, mode_t mode) = 0;
     virtual int changeOwner(int fd, uid_t uid, gid_t gid) = 0;
     virtual int setTimes(int fd, const timespec& access, const timespec& modification) = 0;
@@ -59,6 +59,11 @@ public:
     /// Writes the file's data out and waits, so that on a file system with an ordered journal no later change can
     /// become durable before it. Commits nothing by itself.
     virtual int orderData(int fd) = 0;
+
+    // Looking. Changes nothing that lasts, but asks by a call that could.
+    /// Whether an encryption whose key is away hides what is in the directory: nothing that is not found there is known
+    /// to be missing, and no name that is listed is one.
+    [[nodiscard]] virtual bool hidesNames(int directory) = 0;
 };
 
 } // namespace zor::platform

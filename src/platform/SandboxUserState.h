@@ -3,6 +3,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -19,8 +20,9 @@ public:
     /// 0, else an errno. Any thread; calls for one identifier are serialised by the caller's identifier locks.
     virtual int setMapping(std::uint32_t userId, SandboxItemType type, std::string_view identifier,
                            const std::optional<std::string>& path) = 0;
-    /// Removes every mapping whose target is gone; a launch calls it once. How many were removed.
-    virtual unsigned removeDanglingMappings() = 0;
+    /// Removes every mapping whose target is gone, of the users of whom that may be concluded: a home that is not there
+    /// now comes back with its containers. A launch calls it once. How many were removed.
+    virtual unsigned removeDanglingMappings(const std::function<bool(std::uint32_t userId)>& mayConclude) = 0;
 };
 
 } // namespace zor::platform

@@ -2,9 +2,11 @@
 #include "store/ClassDirectoryReader.h"
 
 #include "fs/BulkDirectoryRead.h"
+#include "fs/Hidden.h"
 #include "fs/Stretches.h"
 #include "platform/Mutex.h"
 
+#include <cerrno>
 #include <iterator>
 #include <map>
 #include <optional>
@@ -26,6 +28,7 @@ public:
         ++count_;
         if (cause && cause->isOwnShortage())
             shortage_ = cause->code();
+        isHidden_ = isHidden_ || (cause && cause->isPosix(ENOKEY));
         first_.emplace(index, std::move(error));
         if (first_.size() > refusalsSaidMax)
             first_.erase(std::prev(first_.end()));
@@ -44,12 +47,17 @@ public:
         const platform::MutexLock held(mutex_);
         return shortage_;
     }
+    [[nodiscard]] bool isHidden() {
+        const platform::MutexLock held(mutex_);
+        return isHidden_;
+    }
 
 private:
     platform::Mutex mutex_;
     std::uint64_t count_ ZOR_GUARDED_BY(mutex_) = 0;
     std::map<std::size_t, ZORError> first_ ZOR_GUARDED_BY(mutex_);
     std::optional<int> shortage_ ZOR_GUARDED_BY(mutex_);
+    bool isHidden_ ZOR_GUARDED_BY(mutex_) = false;
 };
 
 /// The names of a directory in one block of memory, each NUL-terminated.
@@ -71,11 +79,16 @@ Result<void> ClassDirectoryReader::forEach(const std::function<void(std::shared_
                           directory_.c_str(), errorText(number));
     };
     const auto directory = fileManager_.resolver().openDirectory(directory_);
-    if (!directory) {
-        if (directory.error() != ENOENT)
+    platform::Disk& disk = fileManager_.disk();
+    const bool hidden = directory
+                            ? disk.hidesNames(directory->get())
+                            : directory.error() == ENOENT && fs::hiddenBy(fileManager_.resolver(), disk, directory_);
+    if (!directory || hidden) {
+        const int number = hidden ? ENOKEY : directory.error();
+        if (number != ENOENT)
             log_.write(logLevelError, "_IterateDirectory", "opendir of %s failed: %s", directory_.c_str(),
-                       errorText(directory.error()));
-        return failed(directory.error());
+                       errorText(number));
+        return failed(number);
     }
     Names names;
     fs::BulkDirectoryRead::Buffer buffer;
@@ -86,7 +99,7 @@ Result<void> ClassDirectoryReader::forEach(const std::function<void(std::shared_
     if (entries.error() != 0)
         return failed(entries.error());
 
-    const MetadataReader reader(directory->get(), std::make_shared<const std::string>(directory_.path()), userId_,
+    const MetadataReader reader(disk, directory->get(), std::make_shared<const std::string>(directory_.path()), userId_,
                                 CheckClassPath::yes);
     std::vector<std::shared_ptr<ZORMetadata>> records(names.starts.size());
     Refusals refusals;
@@ -100,6 +113,7 @@ Result<void> ClassDirectoryReader::forEach(const std::function<void(std::shared_
         }
     });
     refusals.say(log_, directory_);
+    metHidden_ = refusals.isHidden();
     // What this process could not look at may be a container. Taken for none, it would get a double.
     if (const auto shortage = refusals.shortage())
         return failed(*shortage);

@@ -22,14 +22,17 @@ public:
         : log_(log), fileManager_(fileManager), directory_(std::move(directory)), userId_(userId) {}
 
     /// Calls `found` for each valid container, on this thread; what is not valid is logged and left out. Fails with the
-    /// listing's error, and `found` is then not called.
+    /// listing's error, ENOKEY where an encryption hides the names, and `found` is then not called.
     Result<void> forEach(const std::function<void(std::shared_ptr<ZORMetadata>)>& found);
+    /// Whether an entry of the last listing may be a container that an encryption hides.
+    [[nodiscard]] bool metHidden() const { return metHidden_; }
 
 private:
     const Log& log_;
     ZORFileManager& fileManager_;
     const FileURL directory_;
     const std::uint32_t userId_;
+    bool metHidden_ = false;
 };
 
 } // namespace zor

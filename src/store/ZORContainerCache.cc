@@ -2,7 +2,7 @@
 #include "store/ZORContainerCache.h"
 
 #include "daemon/base/UserIdentity.h"
-#include "fs/OwnedFile.h"
+#include "fs/Hidden.h"
 #include "platform/BlockingScope.h"
 #include "plist/HeldBytes.h"
 #include "store/ClassDirectoryReader.h"
@@ -39,31 +39,78 @@ void ZORContainerCache::traceIdentifier(Here here, const Key& key, const char* w
                    suffix(key.transient), what, ZOR_SHOWN(identifier));
 }
 
+UserHome* ZORContainerCache::homeOf(const Key& key) const {
+    return isPerUserClass(key.containerClass) ? configuration_.homeOf(key.userId) : nullptr;
+}
+
+template <typename Function>
+auto ZORContainerCache::withCurrentHome(const Key& key, Function&& find) {
+    UserHome* const home = homeOf(key);
+    const UserHome::Seen seen = home ? home->lookIfDue() : UserHome::Seen();
+    auto found = find();
+    // That nothing is known of an identifier is the usual answer for one that is new, and no sign of another home.
+    if (!found && seen.state == UserHome::State::present && !found.error().is(ErrorCode::notFound) &&
+        home->look().generation != seen.generation)
+        found = find();
+    return found;
+}
+
+bool ZORContainerCache::isLeftOpen(const ZORError& error, const Key& key) const {
+    if (error.isOwnShortage() || !error.is(ErrorCode::cacheNotRebuilt))
+        return error.isOwnShortage();
+    UserHome* const home = homeOf(key);
+    return (error.underlying() && error.underlying()->isPosix(ENOKEY)) ||
+           (home && home->lookIfDue().state == UserHome::State::missing);
+}
+
 Result<ZORContainerCache::ClassCache*> ZORContainerCache::_getCacheForUserId(const Key& key) {
     if (!userIdIsValidForClass(key.containerClass, key.userId))
         return makeError(log_, ZOR_HERE, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
                          "Invalid cache get-userId %u for class %ld", key.userId, number(key.containerClass));
+    const UserHome* const home = homeOf(key);
     const auto known = caches_.find(key);
-    if (known != caches_.end())
+    if (known != caches_.end() && (!home || known->second.homeGeneration == home->generation()))
         return &known->second;
     ZOR_LOG(log_, logLevelDebug, "Rebuilding container class cache: %u-%s%s", key.userId, className(key.containerClass),
             suffix(key.transient));
     const platform::BlockingScope blocking;
     ClassCache built = TRY(readClassDirectory(key));
-    return &caches_.emplace(key, std::move(built)).first->second;
+    return &caches_.insert_or_assign(key, std::move(built)).first->second;
+}
+
+Result<ZORContainerCache::ClassCache*> ZORContainerCache::wholeCache(const Key& key) {
+    ClassCache* cache = TRY(_getCacheForUserId(key));
+    if (!cache->hidesSome)
+        return cache;
+    ClassCache built = TRY(readClassDirectory(key));
+    for (const Entry& known : cache->entries)
+        if (const auto again = built.entries.find(known);
+            again != built.entries.end() && again->record->place().name() == known.record->place().name())
+            store(built, known);
+    *cache = std::move(built);
+    if (cache->hidesSome)
+        return posixError(ZOR_HERE, ENOKEY, "An encryption whose key is away hides containers of user %u, class %s",
+                          key.userId, className(key.containerClass));
+    return cache;
 }
 
 Result<ZORContainerCache::ClassCache> ZORContainerCache::readClassDirectory(const Key& key) {
+    UserHome* const home = homeOf(key);
+    const auto seen = home ? home->look() : UserHome::Seen();
+    if (home && seen.state == UserHome::State::missing)
+        return posixError(ZOR_HERE, ENOENT, "The home of user %u is not there; the next request looks for it again",
+                          key.userId);
     const auto directory = configuration_.containerDirectoryURLForUser(key.userId, key.containerClass, key.transient);
     if (!directory)
         return posixError(ZOR_HERE, ENOENT, "User %u has no directory for class %s", key.userId,
                           className(key.containerClass));
     ClassDirectoryReader reader(log_, fileManager_, *directory, key.userId);
-    ClassCache cache;
+    ClassCache cache{.entries = {}, .homeGeneration = seen.generation};
     TRY(reader.forEach([&](Record record) {
         record->setTransient(key.transient);
         store(cache, entryOf(std::move(record)));
     }));
+    cache.hidesSome = reader.metHidden();
     // A daemon that was killed may have left containers here that are not on the disk yet; who finds one here is told
     // that it exists.
     const auto opened = fileManager_.resolver().openDirectory(*directory);
@@ -95,10 +142,17 @@ void ZORContainerCache::remove(ClassCache& cache, std::string_view identifier) {
 
 Result<ZORContainerCache::Found> ZORContainerCache::findRecord(const Key& key, const std::string& identifier) {
     const MutexLock held(cacheLock_);
-    const auto cache = _getCacheForUserId(key);
+    constexpr Here here{"containerForUser", __LINE__};
+    auto cache = _getCacheForUserId(key);
     if (!cache)
-        return failedToRebuild({"containerForUser", __LINE__}, key, cache.error());
-    const auto found = (*cache)->entries.find(std::string_view(identifier));
+        return failedToRebuild(here, key, cache.error());
+    auto found = (*cache)->entries.find(std::string_view(identifier));
+    if (found == (*cache)->entries.end() && (*cache)->hidesSome) {
+        cache = wholeCache(key);
+        if (!cache)
+            return failedToRebuild(here, key, cache.error());
+        found = (*cache)->entries.find(std::string_view(identifier));
+    }
     if (found == (*cache)->entries.end())
         return makeError(log_, {"containerForUser", __LINE__}, ErrorCode::notFound, nullptr, LogFlag::no,
                          "Cache: %s%s: Container Not Found with ID: %s", className(key.containerClass),
@@ -123,6 +177,9 @@ Result<void> ZORContainerCache::checkOnDisk(Here here, const Key& key, const Fou
     if (!item && item.error() != ENOENT)
         log_.write(logLevelError, "itemExistsAtURL", "Failed to determine if %s exists: %s", file.c_str(),
                    errorText(item.error()));
+    if (!item && item.error() == ENOENT && fs::hiddenBy(fileManager_.resolver(), fileManager_.disk(), file))
+        return failedToRebuild(here, key,
+                               posixError(here, ENOKEY, "An encryption whose key is away hides %s", file.c_str()));
     std::optional<ZORError> cause;
     if (!item && isOwnShortage(item.error()))
         cause = posixError(here, item.error(), "open of %s failed: %s", file.c_str(), errorText(item.error()));
@@ -143,14 +200,19 @@ Result<ZORContainerCache::Record> ZORContainerCache::containerForUser(std::uint3
             return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes, "Invalid identifier: %s",
                              "(null)");
         const Key key{userId, containerClass, transient};
-        const Found found = TRY(findRecord(key, *identifier));
-        if (found.place.empty())
-            return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
-                             "Cache: %s%s: Invalid URL path string: %s", className(containerClass), suffix(transient),
-                             "(null)");
-        TRY(checkOnDisk(here, key, found, "Found"));
-        return found.record;
+        return withCurrentHome(key, [&] { return findOnDisk(here, key, *identifier); });
     });
+}
+
+Result<ZORContainerCache::Record> ZORContainerCache::findOnDisk(Here here, const Key& key,
+                                                                const std::string& identifier) {
+    const Found found = TRY(findRecord(key, identifier));
+    if (found.place.empty())
+        return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
+                         "Cache: %s%s: Invalid URL path string: %s", className(key.containerClass),
+                         suffix(key.transient), "(null)");
+    TRY(checkOnDisk(here, key, found, "Found"));
+    return found.record;
 }
 
 Result<ZORContainerCache::Record> ZORContainerCache::containerForUser(std::uint32_t userId,
@@ -159,7 +221,7 @@ Result<ZORContainerCache::Record> ZORContainerCache::containerForUser(std::uint3
                                                                       std::string_view uuidString) {
     for (const bool transient : {false, true}) {
         auto record = containerForUser(userId, containerClass, identifier, transient);
-        if (!record && record.error().isOwnShortage())
+        if (!record && isLeftOpen(record.error(), {userId, containerClass, transient}))
             return record;
         if (record && (*record)->uuid().string() == uuidString) {
             // Readers of one container may be here together: nothing is written that is so already.
@@ -179,31 +241,40 @@ ZORContainerCache::allContainersForUser(std::uint32_t userId, ContainerClass con
             return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
                              "Invalid Content Class: %ld", number(containerClass));
         const Key key{userId, containerClass, transient};
-        std::vector<Found> all;
-        {
-            const MutexLock held(cacheLock_);
-            const auto cache = _getCacheForUserId(key);
-            if (!cache)
-                return failedToRebuild(here, key, cache.error());
-            all.reserve((*cache)->entries.size());
-            for (const Entry& entry : (*cache)->entries)
-                all.push_back({.record = entry.record, .place = entry.record->place()});
-        }
-        return thoseOnDisk(here, key, std::move(all));
+        return withCurrentHome(key, [&]() -> Result<std::vector<Record>> {
+            std::vector<Found> all;
+            std::uint64_t homeGeneration = 0;
+            {
+                const MutexLock held(cacheLock_);
+                const auto cache = wholeCache(key);
+                if (!cache)
+                    return failedToRebuild(here, key, cache.error());
+                homeGeneration = (*cache)->homeGeneration;
+                all.reserve((*cache)->entries.size());
+                for (const Entry& entry : (*cache)->entries)
+                    all.push_back({.record = entry.record, .place = entry.record->place()});
+            }
+            return thoseOnDisk(here, key, std::move(all), homeGeneration);
+        });
     });
 }
 
-Result<std::vector<ZORContainerCache::Record>> ZORContainerCache::thoseOnDisk(Here here, const Key& key,
-                                                                              std::vector<Found> found) {
+Result<std::vector<ZORContainerCache::Record>>
+ZORContainerCache::thoseOnDisk(Here here, const Key& key, std::vector<Found> found, std::uint64_t homeGeneration) {
     std::vector<Record> records;
     records.reserve(found.size());
     for (Found& one : found) {
         const auto there = checkOnDisk(here, key, one, "ALL Found");
-        if (!there && there.error().isOwnShortage())
+        if (!there && isLeftOpen(there.error(), key))
             return there.error();
         if (there)
             records.push_back(std::move(one.record));
     }
+    // What went with its home is not gone.
+    UserHome* const home = records.size() == found.size() ? nullptr : homeOf(key);
+    if (home && home->look().generation != homeGeneration)
+        return failedToRebuild(here, key,
+                               posixError(here, ENOENT, "The home of user %u changed meanwhile", key.userId));
     return records;
 }
 
@@ -219,28 +290,32 @@ Result<ZORContainerCache::PageOfRecords> ZORContainerCache::pageOfContainersForU
         const auto before = [](const Record& left, const Record& right) {
             return left->identifier() < right->identifier();
         };
-        std::vector<Found> found;
-        PageOfRecords result;
-        {
-            const MutexLock held(cacheLock_);
-            const auto cache = _getCacheForUserId(key);
-            if (!cache)
-                return failedToRebuild(here, key, cache.error());
-            std::vector<Record> records;
-            records.reserve((*cache)->entries.size());
-            for (const Entry& entry : (*cache)->entries)
-                if (page.after.empty() || entry.record->identifier() > page.after)
-                    records.push_back(entry.record);
-            const auto end =
-                records.begin() + static_cast<std::ptrdiff_t>(std::min(records.size(), page.containersMax));
-            std::partial_sort(records.begin(), end, records.end(), before);
-            if (end != records.end())
-                result.next = end[-1]->identifier();
-            for (auto record = records.begin(); record != end; ++record)
-                found.push_back({.record = *record, .place = (*record)->place()});
-        }
-        result.records = TRY(thoseOnDisk(here, key, std::move(found)));
-        return result;
+        return withCurrentHome(key, [&]() -> Result<PageOfRecords> {
+            std::vector<Found> found;
+            PageOfRecords result;
+            std::uint64_t homeGeneration = 0;
+            {
+                const MutexLock held(cacheLock_);
+                const auto cache = wholeCache(key);
+                if (!cache)
+                    return failedToRebuild(here, key, cache.error());
+                homeGeneration = (*cache)->homeGeneration;
+                std::vector<Record> records;
+                records.reserve((*cache)->entries.size());
+                for (const Entry& entry : (*cache)->entries)
+                    if (page.after.empty() || entry.record->identifier() > page.after)
+                        records.push_back(entry.record);
+                const auto end =
+                    records.begin() + static_cast<std::ptrdiff_t>(std::min(records.size(), page.containersMax));
+                std::partial_sort(records.begin(), end, records.end(), before);
+                if (end != records.end())
+                    result.next = end[-1]->identifier();
+                for (auto record = records.begin(); record != end; ++record)
+                    found.push_back({.record = *record, .place = (*record)->place()});
+            }
+            result.records = TRY(thoseOnDisk(here, key, std::move(found), homeGeneration));
+            return result;
+        });
     });
 }
 
@@ -258,7 +333,8 @@ bool ZORContainerCache::buildAllOfUser(std::uint32_t userId) {
                 (void)_getCacheForUserId(key);
             shortage = shortage || (!directory && isOwnShortage(directory.error()));
         }
-    return !shortage;
+    UserHome* const home = configuration_.homeOf(userId);
+    return !shortage && (!home || home->lookIfDue().state != UserHome::State::missing);
 }
 
 ZORContainerCache::Held ZORContainerCache::heldByUser(std::uint32_t userId) {

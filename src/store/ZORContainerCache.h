@@ -2,9 +2,11 @@
 // Finds containers without scanning the disk: for each user, class and transient flag, the records by identifier.
 //
 // Such a class cache is built from disk when it is first needed and kept; only adding and removing change it, and the
-// setup drops all of them once, before the first client. The disk is the truth all the same: a lookup that returns a
-// record has just seen its metadata file. Code 21 is the one answer that means "does not exist"; every other failure
-// means "not known".
+// setup drops all of them once, before the first client. One of a user's is worth nothing when the user's home has
+// gone, come or become another one, and is built anew then. Where an encryption hides containers, those that are known
+// are found, and of no other is it said that it does not exist. The disk is the truth all the same: a lookup that
+// returns a record has just seen its metadata file. Code 21 is the one answer that means "does not exist"; every other
+// failure means "not known".
 //
 // One mutex guards the class caches and is held while one is built; the checks on disk run after it is released. Who
 // needs a lookup and a later add to be one step holds the identifier locks around both. Exceptions end at these
@@ -45,10 +47,12 @@ public:
     Result<Record> containerForUser(std::uint32_t userId, ContainerClass containerClass, const std::string* identifier,
                                     bool transient);
     /// The record whose internal UUID is `uuidString` (upper-case), live before transient; its transient flag is set
-    /// accordingly. nullptr when there is none; an error only where want of descriptors or memory leaves that open.
+    /// accordingly. nullptr when there is none; an error only where that is left open: for want of descriptors or
+    /// memory, because an encryption hides it, or because the user's home is not there.
     Result<Record> containerForUser(std::uint32_t userId, ContainerClass containerClass, const std::string* identifier,
                                     std::string_view uuidString);
-    /// Every record whose metadata file is still there. Want of descriptors or memory makes none go missing: error 44.
+    /// Every record whose metadata file is still there. Want of descriptors or memory makes none go missing: error 44;
+    /// nor does an encryption, or a home that is not there: error 43.
     Result<std::vector<Record>> allContainersForUser(std::uint32_t userId, ContainerClass containerClass,
                                                      bool transient);
     struct Page {
@@ -72,7 +76,8 @@ public:
     /// Forgets every class cache; each is built anew when it is next needed.
     void dropAll() ZOR_EXCLUDES(cacheLock_);
     /// What a user has, in classes of every kind, transient ones included. The first time that a user is asked for,
-    /// every class cache of the user's is built whose directory is there; later this is a sum over them.
+    /// every class cache of the user's is built whose directory is there; later this is a sum over them. While the
+    /// user's home is missing that comes again.
     struct Held {
         std::size_t containers = 0;
         /// Of memory, of the info values.
@@ -101,6 +106,10 @@ private:
     struct ClassCache {
         std::unordered_set<Entry, IdentifierOf, IdentifierOf> entries;
         std::size_t infoBytes = 0; // the sum of the entries'
+        /// Of the home that they were read from.
+        std::uint64_t homeGeneration = 0;
+        /// There may be others, which an encryption hid when the directory was read.
+        bool hidesSome = false;
     };
     struct Key {
         std::uint32_t userId;
@@ -111,6 +120,9 @@ private:
 
     Result<ClassCache*> _getCacheForUserId(const Key& key) ZOR_REQUIRES(cacheLock_);
     Result<ClassCache> readClassDirectory(const Key& key);
+    /// For who is about to say that something is not there: reads the directory again when some of it was hidden, and
+    /// fails while that is so. The records that are known stay the same objects.
+    Result<ClassCache*> wholeCache(const Key& key) ZOR_REQUIRES(cacheLock_);
     /// False when want of descriptors or memory left one unbuilt.
     bool buildAllOfUser(std::uint32_t userId) ZOR_REQUIRES(cacheLock_);
     /// A record and where it lay when the cache was looked at. Another operation may move the container meanwhile; who
@@ -120,10 +132,20 @@ private:
         ContainerPlace place;
     };
     Result<Found> findRecord(const Key& key, const std::string& identifier) ZOR_EXCLUDES(cacheLock_);
+    Result<Record> findOnDisk(Here here, const Key& key, const std::string& identifier);
+    /// The user's home, for a class of users; nullptr for any other.
+    [[nodiscard]] UserHome* homeOf(const Key& key) const;
+    /// Runs `find`, and once more when it failed over a home that is not the one it began with.
+    template <typename Function>
+    auto withCurrentHome(const Key& key, Function&& find);
+    /// Whether the error says of the container neither that it is there nor that it is not.
+    [[nodiscard]] bool isLeftOpen(const ZORError& error, const Key& key) const;
     ZORError failedToRebuild(Here here, const Key& key, const ZORError& cause);
-    /// Code 44 or 47 unless the record's metadata file is there.
+    /// Code 44 or 47 unless the record's metadata file is there; 43 where that is hidden.
     Result<void> checkOnDisk(Here here, const Key& key, const Found& found, const char* foundFormatPrefix);
-    Result<std::vector<Record>> thoseOnDisk(Here here, const Key& key, std::vector<Found> found);
+    /// Error 43 also when they were of a home that has changed since.
+    Result<std::vector<Record>> thoseOnDisk(Here here, const Key& key, std::vector<Found> found,
+                                            std::uint64_t homeGeneration);
     static Entry entryOf(Record record);
     static void store(ClassCache& cache, Entry entry);
     static void remove(ClassCache& cache, std::string_view identifier);

@@ -29,7 +29,16 @@ constexpr DirectoryAttributes bundlesDirectory{.mode = 0755, .otherOwner = bundl
 
 ZORGlobalConfiguration::ZORGlobalConfiguration(const Log& log, ZORFileManager& fileManager,
                                                const platform::PasswordDatabase& passwords)
-    : log_(log), fileManager_(fileManager), passwords_(passwords), places_(fileManager.resolver()) {}
+    : log_(log), fileManager_(fileManager), places_(fileManager.resolver()) {
+    for (std::uint32_t userId = firstMobileUserId; userId <= lastMobileUserId; ++userId)
+        homes_.push_back(std::make_unique<UserHome>(userId, log, fileManager.resolver(), passwords));
+}
+
+UserHome* ZORGlobalConfiguration::homeOf(std::uint32_t userId) const {
+    if (userId < firstMobileUserId || userId > lastMobileUserId)
+        return nullptr;
+    return homes_[userId - firstMobileUserId].get();
+}
 
 void ZORGlobalConfiguration::makeDirectory(const FileURL& url, const DirectoryAttributes& attributes,
                                            const char* function, const char* what, Intermediates intermediates) {
@@ -44,7 +53,9 @@ ZORPerUserConfiguration* ZORGlobalConfiguration::getPerUserConfigurationForUserI
     const auto known = perUserConfigurations_.find(userId);
     if (known != perUserConfigurations_.end())
         return known->second.get();
-    auto made = ZORPerUserConfiguration::initWithUserId(userId, log_, fileManager_, passwords_);
+    // Outside of them it says so, whosever home it gets.
+    UserHome* const home = homeOf(userId);
+    auto made = ZORPerUserConfiguration::initWithUserId(userId, log_, fileManager_, home ? *home : *homes_.front());
     if (!made)
         return nullptr;
     return perUserConfigurations_.emplace(userId, std::move(made)).first->second.get();

@@ -13,6 +13,7 @@
 #include "platform/Mutex.h"
 #include "platform/Queries.h"
 #include "store/StorePlaces.h"
+#include "store/UserHome.h"
 #include "store/ZORPerUserConfiguration.h"
 
 #include <array>
@@ -20,6 +21,7 @@
 #include <memory>
 #include <optional>
 #include <string_view>
+#include <vector>
 
 namespace zor {
 
@@ -30,6 +32,9 @@ public:
     /// The user's configuration, made at the first call; nullptr outside 501 to 510 (tried and logged again each time).
     /// Lives as long as this object.
     ZORPerUserConfiguration* getPerUserConfigurationForUserId(std::uint32_t userId);
+
+    /// The home of a mobile user, or nullptr outside 501 to 510. No lock; lives as long as this object.
+    [[nodiscard]] UserHome* homeOf(std::uint32_t userId) const;
 
     FileURL sharedContainersDirectory();
     FileURL logDirectory();
@@ -53,7 +58,7 @@ public:
     /// where it is missing: what is staged or deleted is private. Whether it was open.
     Result<bool> closeHomeDirectory();
 
-    /// The class directory, made if missing; absent only for a class or user that has none.
+    /// The class directory, made if missing; absent only for a class or user that has none, or whose home is not there.
     std::optional<FileURL> containerDirectoryURLForUser(std::uint32_t userId, ContainerClass containerClass,
                                                         bool transient);
     /// The same directory, open, for moving containers into it: with what it failed for, its URL is of use for messages
@@ -77,8 +82,8 @@ private:
 
     const Log& log_;
     ZORFileManager& fileManager_;
-    const platform::PasswordDatabase& passwords_;
     const StorePlaces places_;
+    std::vector<std::unique_ptr<UserHome>> homes_; // of every mobile user, in order; never changed
     platform::RecursiveMutex lock_;
     std::map<std::uint32_t, std::unique_ptr<ZORPerUserConfiguration>> perUserConfigurations_ ZOR_GUARDED_BY(lock_);
 };

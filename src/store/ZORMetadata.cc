@@ -2,12 +2,14 @@
 #include "store/ZORMetadata.h"
 
 #include "fs/DictionaryFile.h"
+#include "fs/Hidden.h"
 #include "fs/OwnedFile.h"
 #include "ipc/Identifier.h"
 #include "plist/Binary.h"
 #include "plist/Read.h"
 #include "store/Names.h"
 
+#include <cerrno>
 #include <fcntl.h>
 
 namespace zor {
@@ -143,10 +145,10 @@ std::expected<std::shared_ptr<ZORMetadata>, MetadataRefusal> parseMetadata(std::
         info ? std::make_shared<const plist::Dictionary>(*info->asDictionary()) : nullptr, place);
 }
 
-MetadataReader::MetadataReader(int directory, std::shared_ptr<const std::string> parentPath, std::uint32_t userId,
-                               CheckClassPath checkClassPath, std::optional<uid_t> formerOwner)
-    : directory_(directory), parentPath_(std::move(parentPath)), userId_(userId), checkClassPath_(checkClassPath),
-      formerOwner_(formerOwner) {}
+MetadataReader::MetadataReader(platform::Disk& disk, int directory, std::shared_ptr<const std::string> parentPath,
+                               std::uint32_t userId, CheckClassPath checkClassPath, std::optional<uid_t> formerOwner)
+    : disk_(disk), directory_(directory), parentPath_(std::move(parentPath)), userId_(userId),
+      checkClassPath_(checkClassPath), formerOwner_(formerOwner) {}
 
 Result<std::shared_ptr<ZORMetadata>> MetadataReader::read(const char* name) const {
     auto judged = judge(name);
@@ -160,7 +162,9 @@ std::expected<std::shared_ptr<ZORMetadata>, MetadataRefusal> MetadataReader::jud
     const std::string relative = std::string(name) + "/" + names::metadataFile;
     const auto bytes = fs::readOwnedFile(directory_, relative.c_str(), fs::metadataFileBytesMax, formerOwner_);
     if (!bytes) {
-        const ZORError cause = posixError(ZOR_HERE, bytes.error(), "%s", errorText(bytes.error()));
+        const bool hidden = bytes.error() == ENOENT && fs::hidesNamesBelow(disk_, directory_, name);
+        const int number = hidden ? ENOKEY : bytes.error();
+        const ZORError cause = posixError(ZOR_HERE, number, "%s", errorText(number));
         return refusal(MetadataRule::readable, ErrorCode::metadataUnreadable, __LINE__,
                        formatted("Failed to read metadata at URL %s", place.url().c_str()),
                        std::make_shared<const ZORError>(cause));
@@ -175,8 +179,9 @@ Result<std::shared_ptr<ZORMetadata>> readAndValidateMetadataAtUrl(const Log& log
     const FileURL parent = url.deletingLastPathComponent();
     const auto directory = fileManager.resolver().openDirectoryPath(parent);
     // Without its directory, the read below says what is wrong with the container.
-    const MetadataReader reader(directory ? directory->get() : -1, std::make_shared<const std::string>(parent.path()),
-                                userId, checkClassPath, formerOwner);
+    const MetadataReader reader(fileManager.disk(), directory ? directory->get() : -1,
+                                std::make_shared<const std::string>(parent.path()), userId, checkClassPath,
+                                formerOwner);
     auto record = reader.read(std::string(url.lastPathComponent()).c_str());
     if (!record)
         logError(log, record.error());

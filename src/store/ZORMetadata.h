@@ -111,19 +111,22 @@ Result<std::shared_ptr<ZORMetadata>> readAndValidateMetadataAtUrl(const Log& log
                                                                   CheckClassPath checkClassPath,
                                                                   std::optional<uid_t> formerOwner = std::nullopt);
 
-/// Reads many containers of one directory: the directory is open, and nothing about it is worked out twice.
+/// Reads many containers of one directory: the directory is open, and nothing about it is worked out twice. A file that
+/// an encryption hides is not missing: the cause is ENOKEY.
 /// Errors are made without a log line, so that threads may share the work and one of them can say the errors in order.
 class MetadataReader {
 public:
     /// `directory` is open and stays so; `parentPath` is its path.
-    MetadataReader(int directory, std::shared_ptr<const std::string> parentPath, std::uint32_t userId,
-                   CheckClassPath checkClassPath, std::optional<uid_t> formerOwner = std::nullopt);
+    MetadataReader(platform::Disk& disk, int directory, std::shared_ptr<const std::string> parentPath,
+                   std::uint32_t userId, CheckClassPath checkClassPath,
+                   std::optional<uid_t> formerOwner = std::nullopt);
     /// The container `name` in the directory. Any thread.
     [[nodiscard]] Result<std::shared_ptr<ZORMetadata>> read(const char* name) const;
     /// The same, with the rule that it breaks.
     [[nodiscard]] std::expected<std::shared_ptr<ZORMetadata>, MetadataRefusal> judge(const char* name) const;
 
 private:
+    platform::Disk& disk_;
     const int directory_;
     const std::shared_ptr<const std::string> parentPath_;
     const std::uint32_t userId_;

@@ -4,61 +4,43 @@
 #include "daemon/base/UserIdentity.h"
 #include "store/StorePlaces.h"
 
-#include <cerrno>
-#include <climits>
-#include <cstdlib>
-
 namespace zor {
 
 using platform::RecursiveMutexLock;
 
-std::unique_ptr<ZORPerUserConfiguration>
-ZORPerUserConfiguration::initWithUserId(std::uint32_t userId, const Log& log, ZORFileManager& fileManager,
-                                        const platform::PasswordDatabase& passwords) {
+std::unique_ptr<ZORPerUserConfiguration> ZORPerUserConfiguration::initWithUserId(std::uint32_t userId, const Log& log,
+                                                                                 ZORFileManager& fileManager,
+                                                                                 UserHome& home) {
     if (userId < firstMobileUserId || userId > lastMobileUserId) {
         log.write(logLevelError, __func__, "userId: %u must be in range", userId);
         return nullptr;
     }
-    std::unique_ptr<ZORPerUserConfiguration> made(new ZORPerUserConfiguration(userId, log, fileManager, passwords));
-    const auto home = made->userHomeDirectory();
-    if (!home)
+    std::unique_ptr<ZORPerUserConfiguration> made(new ZORPerUserConfiguration(userId, log, fileManager, home));
+    const auto seen = home.look();
+    if (seen.state == UserHome::State::noAccount || seen.state == UserHome::State::unknown)
         log.write(logLevelError, __func__, "Failed to getpwuid for uid: %u", userId);
-    log.write(logLevelError, __func__, "user home Dir: %s", home ? home->c_str() : "(null)");
+    log.write(logLevelError, __func__, "user home Dir: %s", seen.directory ? seen.directory->c_str() : "(null)");
     return made;
 }
 
-std::expected<FileURL, int> ZORPerUserConfiguration::homeOf(const platform::PasswordDatabase& passwords,
-                                                            std::uint32_t userId) {
-    const auto entry = passwords.entryForUserId(userId);
-    if (!entry)
-        return std::unexpected(entry.error());
-    // A home may be reached through links that its administrator made; below it, none is followed.
-    char resolved[PATH_MAX];
-    const char* path = ::realpath(entry->homeDirectory.c_str(), resolved);
-    if (!path && isOwnShortage(errno))
-        return std::unexpected(errno);
-    return FileURL::directory(path ? path : entry->homeDirectory);
-}
-
 std::optional<FileURL> ZORPerUserConfiguration::userHomeDirectory() {
-    const RecursiveMutexLock held(lock_);
-    if (!homeIsLookedUp_) {
-        auto home = homeOf(passwords_, userId_);
-        homeIsLookedUp_ = home || !isOwnShortage(home.error());
-        if (home)
-            userHomeDirectory_ = std::move(*home);
-    }
-    return userHomeDirectory_;
-}
-
-bool ZORPerUserConfiguration::isKnownToHaveNoHome() {
-    const RecursiveMutexLock held(lock_);
-    return !userHomeDirectory() && homeIsLookedUp_;
+    return home_.lookIfDue().directory;
 }
 
 bool ZORPerUserConfiguration::existsUserBaseDirectory() {
-    const auto home = userHomeDirectory();
-    return home && fileManager_.itemExistsAtURL(*home);
+    return home_.look().state == UserHome::State::present;
+}
+
+std::optional<UsableDirectory> ZORPerUserConfiguration::openHome() {
+    auto home = home_.look().directory;
+    if (!home)
+        return std::nullopt;
+    auto opened = fileManager_.resolver().openDirectoryPath(*home);
+    if (!opened)
+        return judged(std::move(*home),
+                      posixError(ZOR_HERE, opened.error(), "open of the home failed: %s", errorText(opened.error())),
+                      "userHomeDirectory", "user base");
+    return UsableDirectory{.url = std::move(*home), .opened = std::move(*opened)};
 }
 
 UsableDirectory ZORPerUserConfiguration::judged(FileURL url, Result<platform::FileDescriptor> opened,
@@ -73,7 +55,8 @@ UsableDirectory ZORPerUserConfiguration::openBelow(const UsableDirectory& base, 
                                                    const char* what) {
     if (!base.opened)
         return judged(std::move(url), base.opened.error(), function, what);
-    const std::string relative = url.path().substr(base.url.path().size() + 1);
+    const std::string& top = base.url.path();
+    const std::string relative = url.path().substr(top == "/" ? 1 : top.size() + 1);
     return judged(std::move(url),
                   fileManager_.openOrCreateDirectoryBelow(base.opened->get(), base.url, relative, Intermediates::yes,
                                                           {.mode = 0755, .owner = userId_}),
@@ -82,12 +65,10 @@ UsableDirectory ZORPerUserConfiguration::openBelow(const UsableDirectory& base, 
 
 std::optional<UsableDirectory> ZORPerUserConfiguration::openUserBaseDirectory() {
     const RecursiveMutexLock held(lock_);
-    const auto home = userHomeDirectory();
+    const auto home = openHome();
     if (!home)
         return std::nullopt;
-    FileURL url = StorePlaces::userBaseDirectory(*home);
-    auto opened = fileManager_.openOrCreateDirectoryAtURL(url, Intermediates::yes, {.mode = 0755, .owner = userId_});
-    return judged(std::move(url), std::move(opened), "userBaseDirectory", "user base");
+    return openBelow(*home, StorePlaces::userBaseDirectory(home->url), "userBaseDirectory", "user base");
 }
 
 std::optional<UsableDirectory> ZORPerUserConfiguration::openTransientDirectory() {
@@ -95,8 +76,8 @@ std::optional<UsableDirectory> ZORPerUserConfiguration::openTransientDirectory()
     const auto base = openUserBaseDirectory();
     if (!base)
         return std::nullopt;
-    return openBelow(*base, StorePlaces::userTransientDirectory(*userHomeDirectory_), "transientDirectory",
-                     "transient");
+    return openBelow(*base, StorePlaces::userTransientDirectory(base->url.deletingLastPathComponent()),
+                     "transientDirectory", "transient");
 }
 
 std::optional<UsableDirectory> ZORPerUserConfiguration::openClassDirectory(ContainerClass containerClass,

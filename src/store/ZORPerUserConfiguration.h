@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Where the containers of one mobile user lie. Getters never fail: they make their directory on every call, log when
-// they cannot, and return the place anyway. A home that is not known makes every place below it absent.
+// they cannot, and return the place anyway. A home that is not there makes every place below it absent; the home itself
+// is never made, nor anything on the way to it.
 //
 // Its own recursive lock is held for a whole getter. Lock order: the global configuration's lock before this one.
 #pragma once
@@ -9,9 +10,8 @@
 #include "daemon/base/FileURL.h"
 #include "fs/ZORFileManager.h"
 #include "platform/Mutex.h"
-#include "platform/Queries.h"
+#include "store/UserHome.h"
 
-#include <expected>
 #include <memory>
 #include <optional>
 
@@ -27,18 +27,11 @@ class ZORPerUserConfiguration {
 public:
     /// nullptr, with a log line, for a user id outside 501 to 510.
     static std::unique_ptr<ZORPerUserConfiguration> initWithUserId(std::uint32_t userId, const Log& log,
-                                                                   ZORFileManager& fileManager,
-                                                                   const platform::PasswordDatabase& passwords);
-
-    /// The home that the password database names, without links; the database's errno when it names none.
-    [[nodiscard]] static std::expected<FileURL, int> homeOf(const platform::PasswordDatabase& passwords,
-                                                            std::uint32_t userId);
+                                                                   ZORFileManager& fileManager, UserHome& home);
 
     [[nodiscard]] std::uint32_t userId() const { return userId_; }
-    /// Looked up once; again where this process had no descriptors or memory left to ask with.
+    /// Absent while there is none; then looked for again at each call.
     [[nodiscard]] std::optional<FileURL> userHomeDirectory();
-    /// Whether the password database has answered, and names no home.
-    [[nodiscard]] bool isKnownToHaveNoHome();
     /// Whether the home exists; makes nothing.
     [[nodiscard]] bool existsUserBaseDirectory();
     std::optional<FileURL> userBaseDirectory();
@@ -50,9 +43,10 @@ public:
     std::optional<UsableDirectory> openClassDirectory(ContainerClass containerClass, bool transient);
 
 private:
-    ZORPerUserConfiguration(std::uint32_t userId, const Log& log, ZORFileManager& fileManager,
-                            const platform::PasswordDatabase& passwords)
-        : userId_(userId), log_(log), fileManager_(fileManager), passwords_(passwords) {}
+    ZORPerUserConfiguration(std::uint32_t userId, const Log& log, ZORFileManager& fileManager, UserHome& home)
+        : userId_(userId), log_(log), fileManager_(fileManager), home_(home) {}
+    /// The home as it is now; nothing is made.
+    std::optional<UsableDirectory> openHome();
     std::optional<UsableDirectory> openUserBaseDirectory();
     std::optional<UsableDirectory> openTransientDirectory();
     /// Below `base`, unless that is no directory of the user's.
@@ -63,10 +57,8 @@ private:
     const std::uint32_t userId_;
     const Log& log_;
     ZORFileManager& fileManager_;
-    const platform::PasswordDatabase& passwords_;
+    UserHome& home_;
     platform::RecursiveMutex lock_;
-    std::optional<FileURL> userHomeDirectory_ ZOR_GUARDED_BY(lock_);
-    bool homeIsLookedUp_ ZOR_GUARDED_BY(lock_) = false; // the database has answered; nothing changes any more
 };
 
 } // namespace zor

@@ -3,6 +3,7 @@
 #include "check/Repair.h"
 #include "check/ShellText.h"
 #include "entitlements/EntitlementFile.h"
+#include "support/EncryptedDisk.h"
 #include "support/FileTree.h"
 #include "world/World.h"
 
@@ -220,6 +221,28 @@ const std::vector<Damage>& damages() {
 }
 
 // Goal: each kind of damage is found, as what it is, and nothing else is; looking at it changes nothing, follows no
+// What is locked is no damage: one finding says so of what hides it, and nothing of what is in it is mended or missed.
+TEST(StoreCheckTest, WhatIsLockedIsNotDamaged) {
+    Store store;
+    support::EncryptedDisk disk(store.world.path("private/var/encrypted"));
+    if (!disk.missing().empty())
+        GTEST_SKIP() << "skipped: " << disk.missing();
+    const std::string below = disk.directory().substr(store.world.path().size());
+    store.world.write("etc/passwd", "mobile:x:501:501::/private/var/mobile:/bin/sh\n"
+                                    "third:x:503:503::" +
+                                        below + ":/bin/sh\n");
+    EXPECT_EQ(::chown(disk.directory().c_str(), 503, 503), 0);
+    const std::string container = store.create("org.locked", ContainerClass::dataApplication, 503);
+    store.map(container, "org.locked");
+    EXPECT_EQ(textOf(store.check()), "");
+    store.world.restart(); // whatever it holds open keeps the key there
+    ASSERT_TRUE(disk.takeKeyAway());
+    const auto findings = store.check();
+    ASSERT_EQ(findings.size(), 1U) << textOf(findings);
+    EXPECT_EQ(findings[0].code, FindingCode::unexamined);
+    EXPECT_EQ("/" + findings[0].path, below);
+}
+
 // link and waits for nobody. Method: a real store, damaged in one way for each row; the tree before and after compared.
 TEST(StoreCheckTest, FindsEachDamageAndChangesNothing) {
     for (const Damage& damage : damages()) {

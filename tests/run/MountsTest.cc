@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "zorvane-run/Mounts.h"
+#include "support/EncryptedDisk.h"
 #include "support/FileTree.h"
 
 #include <algorithm>
@@ -96,6 +97,22 @@ TEST(Mounts, WhatIsNoContainerIsRefused) {
             EXPECT_NE(said.find(paths[kind]), std::string::npos) << said;
         }
     }
+}
+
+// Nothing is started on a container that is locked: the program would find nothing of its own, and could make nothing.
+TEST(Mounts, ALockedContainerIsRefused) {
+    World world;
+    zor::support::EncryptedDisk disk(world.below("private/var/mobile/Containers/Data/Application/E"));
+    if (!disk.missing().empty())
+        GTEST_SKIP() << "skipped: " << disk.missing();
+    World::make(disk.directory() + "/tmp", world.user());
+    World::make(disk.directory(), world.user());
+    world.told.data = disk.directory();
+    world.told.temporary = disk.directory() + "/tmp";
+    ASSERT_EQ(world.open(), "");
+    world.mounts.clear();
+    ASSERT_TRUE(disk.takeKeyAway());
+    EXPECT_NE(world.open().find("is locked"), std::string::npos);
 }
 
 // A directory to read never opens a way to containers, nor hides what the sandbox has of its own.

@@ -3,8 +3,10 @@
 // look at what has to be there afterwards.
 #include "entitlements/ZOREntitlementMapping.h"
 #include "platform/ServiceListener.h"
+#include "support/EncryptedDisk.h"
 #include "world/World.h"
 
+#include <array>
 #include <filesystem>
 #include <functional>
 #include <gtest/gtest.h>
@@ -77,6 +79,63 @@ void registerProgram(World& world, const std::string& file, const std::string& p
                                   {"Entitlements", Dictionary{{appGroups, Array{group}}}}}));
 }
 
+/// Moves mobile's home away or back.
+void moveHome(World& world, const char* from, const char* to) {
+    std::filesystem::rename(world.path(from), world.path(to));
+}
+constexpr const char* home = "private/var/mobile";
+constexpr const char* away = "private/var/away";
+
+/// Judges what is there of a user whose groups wait in data containers that nobody can see now.
+void expectNothingConcluded(World& world, const std::string& otherMarker = bundleMarker) {
+    for (const std::string& marker : {std::string(groupMarkerPath), otherMarker})
+        EXPECT_FALSE(!marker.empty() && world.exists(marker)) << marker;
+    EXPECT_EQ(codeOf(world.find("app")), ErrorCode::cacheNotRebuilt);
+    EXPECT_EQ(codeOf(world.create("other")), ErrorCode::cacheNotRebuilt);
+    EXPECT_EQ(::readlink(world.path("run/zorvane/sandbox/501/1/app").c_str(), std::array<char, 4096>().data(), 4096) >
+                  0,
+              true);
+}
+
+/// A data container of mobile's that names a group which the second user has a container of, and its mapping.
+void putReferenced(World& world) {
+    world.write("etc/passwd", "mobile:x:501:501::/private/var/mobile:/bin/sh\n"
+                              "second:x:502:502::/private/var/second:/bin/sh\n");
+    putWithGroup(world, "app", "group.old");
+    putGroup(world, "group.old", uuids[0]);
+    ASSERT_EQ(world.sandbox.setMapping(mobile, platform::SandboxItemType::dataContainer, "app",
+                                       world.path(applications + "/" + uuids[0])),
+              0);
+}
+
+void expectReferenced(World& world) {
+    EXPECT_TRUE(world.find("app"));
+    EXPECT_EQ(codeOf(world.find("other")), ErrorCode::notFound);
+    boot(world);
+    EXPECT_TRUE(world.exists(groupMarkerPath) && world.exists(bundleMarker));
+    EXPECT_EQ(world.services().entitlements().appGroupIdentifiersForIdentifier("app"),
+              ZOREntitlementMapping::Identifiers({"group.old"}));
+}
+
+/// A disk that sees an encryption without its key on one directory, and makes nothing there. The test moves aside what
+/// the kernel hides then.
+void lock(World& world, const std::string& directory) {
+    const auto locked = [path = world.path(directory)](int fd) {
+        return std::filesystem::read_symlink("/proc/self/fd/" + std::to_string(fd)) == path;
+    };
+    world.disk().locked = locked;
+    world.disk().arm({.error = ENOKEY,
+                      .span = support::FaultSpan::fromThenOn,
+                      .filter = [locked](const support::DiskCallInfo& call) {
+                          return call.call == DiskCall::makeDirectory && locked(call.fd);
+                      }});
+}
+
+void unlock(World& world) {
+    world.disk().locked = {};
+    world.disk().disarm();
+}
+
 struct Condition {
     const char* name;
     std::function<void(World&)> meet;
@@ -130,6 +189,76 @@ TEST(BootConditions, CostNothing) {
          },
          {bundleMarker},
          [](World& world) { EXPECT_TRUE(world.find("bundle", ContainerClass::bundleApplication)); }},
+        {"a home that comes after the boot",
+         [](World& world) {
+             putReferenced(world);
+             moveHome(world, home, away);
+             boot(world);
+             expectNothingConcluded(world);
+             EXPECT_FALSE(world.exists(home));
+             moveHome(world, away, home);
+         },
+         {groupsOfSecond + "/" + uuids[0]},
+         expectReferenced},
+        {"a home that another one takes the place of, and back",
+         [](World& world) {
+             putReferenced(world);
+             boot(world);
+             ASSERT_TRUE(world.find("app"));
+             moveHome(world, home, away);
+             EXPECT_EQ(codeOf(world.find("app")), ErrorCode::cacheNotRebuilt);
+             EXPECT_EQ(codeOf(world.create("new")), ErrorCode::cacheNotRebuilt);
+             EXPECT_EQ(codeOf(world.daemonsClient().containersForUser(mobile, application, false)),
+                       ErrorCode::cacheNotRebuilt);
+             EXPECT_FALSE(world.exists(home));
+             world.makeDirectories(home, mobile);
+             EXPECT_EQ(codeOf(world.find("app")), ErrorCode::notFound);
+             world.make("app");
+             std::filesystem::remove_all(world.path(home));
+             moveHome(world, away, home);
+             // Made anew, it would be there twice.
+             EXPECT_EQ(world.make("app").path, world.path(applications + "/" + uuids[0]));
+         },
+         {groupsOfSecond + "/" + uuids[0]},
+         expectReferenced},
+        {"a user who is added",
+         [](World& world) {
+             world.boot();
+             EXPECT_FALSE(world.create("app", application, false, 505));
+             world.makeDirectories("home/added", 505);
+             world.write("etc/passwd", "added:x:505:505::/home/added:/bin/sh\n");
+             world.make("app", application, false, 505);
+         },
+         {"home/added/Containers/Data/Application"},
+         [](World&) {}},
+        {"a home that is locked",
+         [](World& world) {
+             putReferenced(world);
+             moveHome(world, mobileContainers, away);
+             lock(world, home);
+             boot(world);
+             expectNothingConcluded(world);
+             EXPECT_FALSE(world.exists(mobileContainers));
+             unlock(world);
+             moveHome(world, away, mobileContainers);
+         },
+         {groupsOfSecond + "/" + uuids[0]},
+         expectReferenced},
+        {"a container that is locked",
+         [](World& world) {
+             putReferenced(world);
+             world.make("known");
+             const std::string file = applications + "/" + uuids[0] + "/" + names::metadataFile;
+             moveHome(world, file.c_str(), away);
+             lock(world, applications + "/" + uuids[0]);
+             boot(world);
+             expectNothingConcluded(world, "");
+             EXPECT_TRUE(world.find("known"));
+             moveHome(world, away, file.c_str());
+             unlock(world);
+         },
+         {groupsOfSecond + "/" + uuids[0], applications + "/" + uuids[0]},
+         expectReferenced},
         {"two entries of one identifier",
          [](World& world) {
              registerProgram(world, "a.plist", std::filesystem::read_symlink("/proc/self/exe"), "group.a");
@@ -164,6 +293,33 @@ TEST(BootConditions, CostNothing) {
             EXPECT_TRUE(world.exists(path)) << path;
         condition.judge(world);
     }
+}
+
+// Goal: the same where the kernel itself hides what is there. Method: mobile's home on an encrypted file system; a boot
+// while its key is away, requests before, meanwhile and after.
+TEST(BootConditions, ALockedFileSystem) {
+    World world;
+    support::EncryptedDisk disk(world.path("private/var/encrypted"));
+    if (!disk.missing().empty())
+        GTEST_SKIP() << "skipped: " << disk.missing();
+    world.write("etc/passwd", "mobile:x:501:501::" + disk.directory().substr(world.path().size()) + ":/bin/sh\n");
+    world.write(bundleMarker, "");
+    world.restart();
+    const FoundContainer found = world.make("app");
+    ASSERT_EQ(world.sandbox.setMapping(mobile, platform::SandboxItemType::dataContainer, "app", found.path), 0);
+    ASSERT_TRUE(disk.takeKeyAway());
+    EXPECT_EQ(codeOf(world.find("app")), ErrorCode::cacheNotRebuilt);
+    EXPECT_EQ(codeOf(world.daemonsClient().metadataForUser(
+                  {.userId = mobile, .uuid = found.uuid, .identifier = "app", .containerClass = application})),
+              ErrorCode::cacheNotRebuilt);
+    boot(world);
+    expectNothingConcluded(world, "");
+    ASSERT_TRUE(disk.giveKey());
+    EXPECT_EQ(world.find("app")->path, found.path);
+    boot(world);
+    EXPECT_EQ(world.find("app")->path, found.path);
+    EXPECT_TRUE(world.exists(groupMarkerPath));
+    world.restart();
 }
 
 } // namespace

@@ -244,6 +244,7 @@ void putWithGroup(const World& world, const std::string& directory, std::uint64_
 // Goal: groups kept in containers come into the map, once; an error keeps the marker away. Method: the second fails.
 TEST(Migration, GroupIdentifiers) {
     World world({.logLevel = logLevelDebug});
+    world.write("etc/passwd", "mobile:x:501:501::/private/var/mobile:/bin/sh\n");
     putWithGroup(world, applications, 2, "com.example.a", firstUuid);
     putWithGroup(world, std::string(mobileContainers) + "/Data/KolvexPlugin", 4, "com.example.b", secondUuid);
     world.load();

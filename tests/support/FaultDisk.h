@@ -54,6 +54,11 @@ public:
     [[nodiscard]] DiskCallInfo metCall() const;
 
     int write(int fd, std::span<const std::uint8_t> bytes) override;
+    /// Directories that are encrypted as far as the daemon can see, besides those that are; their names stay readable.
+    [[nodiscard]] bool hidesNames(int directory) override {
+        return (locked && locked(directory)) || InterceptedDisk::hidesNames(directory);
+    }
+    std::function<bool(int directory)> locked;
 
 protected:
     ssize_t intercept(const DiskCallInfo& info, const Make& make) override;

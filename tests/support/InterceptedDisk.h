@@ -75,6 +75,7 @@ public:
     int orderData(int fd) override {
         return pass({DiskCall::orderData, "", fd}, [&] { return inner_.orderData(fd); });
     }
+    [[nodiscard]] bool hidesNames(int directory) override { return inner_.hidesNames(directory); }
 
 protected:
     /// `make` makes the call on the inner disk.

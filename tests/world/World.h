@@ -94,7 +94,9 @@ public:
         const int failure = path ? setError : removeError;
         return failure != 0 ? failure : inner->setMapping(userId, type, identifier, path);
     }
-    unsigned removeDanglingMappings() override { return inner->removeDanglingMappings(); }
+    unsigned removeDanglingMappings(const std::function<bool(std::uint32_t)>& mayConclude) override {
+        return inner->removeDanglingMappings(mayConclude);
+    }
     platform::SandboxUserState* inner = nullptr;
     int setError = 0;
     int removeError = 0;

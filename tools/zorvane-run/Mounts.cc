@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Mounts.h"
 
+#include "platform/linux/HiddenNames.h"
 #include "platform/linux/Openat2.h"
 
 #include <algorithm>
@@ -46,12 +47,18 @@ Failure notFound(const std::string& cannot, const std::string& path, const std::
 
 std::expected<FileDescriptor, int> openPlain(const Root& root, const std::string& path) {
     const std::string relative = path.substr(root.path == "/" ? 1 : root.path.size() + 1);
-    return openBeneath(root.descriptor.get(), relative.c_str(), O_PATH | O_DIRECTORY);
+    auto opened = openBeneath(root.descriptor.get(), relative.c_str(), O_PATH | O_DIRECTORY);
+    // A program would find nothing of its own there, and make it anew.
+    if (opened && zor::platform::hidesNames(opened->get()))
+        return std::unexpected(ENOKEY);
+    return opened;
 }
 
 std::string cannotOpen(const std::string& place, int error) {
     if (error == ELOOP)
         return place + " is a symbolic link, or lies behind one";
+    if (error == ENOKEY)
+        return place + " is locked: it is encrypted, and its key is not there";
     return withReason(place + " cannot be opened", error);
 }
 

@@ -1,6 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/base/UserIdentity.h"
 
+#include <utility>
+
 namespace zor {
 
 bool userIdIsValidForClass(ContainerClass containerClass, std::uint32_t userId) {
@@ -42,10 +44,10 @@ std::uint32_t UserIdentity::getCurrentMobileUserId() {
     const auto entry = passwords_.entryForName("mobile");
     if (entry)
         log_.write(logLevelError, function, "Current mobile user ID is %u", entry->uid);
-    else
+    else if (!std::exchange(saidMissing_, true))
         log_.write(logLevelError, function, "Failed to get mobile uid. This is bad");
     const std::uint32_t userId = entry ? entry->uid : 0;
-    if (entry || !isOwnShortage(entry.error()))
+    if (entry)
         mobileUserId_ = userId;
     return userId;
 }

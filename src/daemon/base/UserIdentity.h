@@ -28,14 +28,15 @@ public:
     /// The user that a request acts on, or error 38 (logged). `requested` is the low 32 bits of what the client sent.
     [[nodiscard]] Result<std::uint32_t> validateUserId(std::uint32_t requested, ContainerClass containerClass,
                                                        std::uint32_t clientUserId);
-    /// The uid of the account "mobile", 0 when there is none. Looked up once, and again where this process had no
-    /// descriptors or memory left to ask with; concurrent first callers wait for it.
+    /// The uid of the account "mobile", 0 when there is none. Looked up once, and again as long as it was not found: an
+    /// account can be added. Concurrent first callers wait for it.
     [[nodiscard]] std::uint32_t getCurrentMobileUserId();
 
 private:
     const Log& log_;
     const platform::PasswordDatabase& passwords_;
     platform::Mutex lookup_; // held while the database is asked
+    bool saidMissing_ ZOR_GUARDED_BY(lookup_) = false;
     static constexpr std::int64_t notLookedUp = -1;
     std::atomic<std::int64_t> mobileUserId_{notLookedUp};
 };

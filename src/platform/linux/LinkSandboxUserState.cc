@@ -75,13 +75,15 @@ int LinkSandboxUserState::setMapping(std::uint32_t userId, SandboxItemType type,
     return -renamed;
 }
 
-unsigned LinkSandboxUserState::removeDanglingMappings() {
+unsigned LinkSandboxUserState::removeDanglingMappings(const std::function<bool(std::uint32_t userId)>& mayConclude) {
     unsigned removed = 0;
     forEachSandboxDirectory(root_, [&](const SandboxDirectory& directory) {
+        const auto userId = directory.userId();
+        const bool concludes = !userId || mayConclude(*userId);
         for (const std::string& name : directoryNamesIfAny(directory.descriptor)) {
             if (isSandboxLeftover(name))
                 (void)disk_.unlinkFile(directory.descriptor, name.c_str());
-            else if (isDanglingSandboxLink(root_, directory.descriptor, name.c_str()) &&
+            else if (concludes && isDanglingSandboxLink(root_, disk_, directory.descriptor, name.c_str()) &&
                      disk_.unlinkFile(directory.descriptor, name.c_str()) == 0)
                 ++removed;
         }

@@ -2,11 +2,13 @@
 #include "platform/linux/LinuxDisk.h"
 
 #include "platform/BlockingScope.h"
+#include "platform/linux/HiddenNames.h"
 
 #include <cerrno>
 #include <cstdio>
 #include <fcntl.h>
 #include <linux/fs.h>
+#include <string>
 #include <sys/ioctl.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
@@ -97,7 +99,10 @@ int LinuxDisk::setTimes(int fd, const timespec& access, const timespec& modifica
 }
 
 int LinuxDisk::setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) {
-    return checked([&] { return ::fsetxattr(fd, name, value.data(), value.size(), 0); });
+    const int set = checked([&] { return ::fsetxattr(fd, name, value.data(), value.size(), 0); });
+    // One that was opened for its path alone is reached by the kernel's link to it.
+    const std::string link = set == -EBADF && fd >= 0 ? "/proc/self/fd/" + std::to_string(fd) : "";
+    return link.empty() ? set : checked([&] { return ::setxattr(link.c_str(), name, value.data(), value.size(), 0); });
 }
 
 int LinuxDisk::setInodeFlags(int fd, int flags) {
@@ -145,6 +150,10 @@ int LinuxDisk::orderData(int fd) {
     constexpr unsigned whole = SYNC_FILE_RANGE_WAIT_BEFORE | SYNC_FILE_RANGE_WRITE | SYNC_FILE_RANGE_WAIT_AFTER;
     const int result = checked([&] { return ::sync_file_range(fd, 0, 0, whole); });
     return result == -ENOSYS ? checked([&] { return ::fdatasync(fd); }) : result;
+}
+
+bool LinuxDisk::hidesNames(int directory) {
+    return platform::hidesNames(directory);
 }
 
 } // namespace zor::platform

@@ -37,6 +37,8 @@ public:
     int syncFileSystem(int fd) override;
     int orderData(int fd) override;
 
+    [[nodiscard]] bool hidesNames(int directory) override;
+
 private:
     const Syncs syncs_;
     const bool ownershipCanChange_;

@@ -6,6 +6,7 @@
 #include "platform/linux/Openat2.h"
 
 #include <cerrno>
+#include <charconv>
 #include <climits>
 #include <fcntl.h>
 #include <unistd.h>
@@ -27,7 +28,31 @@ void forEachSandboxDirectory(const SystemRoot& root, const std::function<void(co
     }
 }
 
-bool isDanglingSandboxLink(const SystemRoot& root, int directory, const char* name) {
+std::optional<std::uint32_t> SandboxDirectory::userId() const {
+    std::uint32_t number = 0;
+    const char* const end = user.data() + user.size();
+    const auto [last, error] = std::from_chars(user.data(), end, number);
+    return error == std::errc() && last == end ? std::optional(number) : std::nullopt;
+}
+
+namespace {
+
+/// Whether the nearest directory that is there, above what is not, hides what is in it.
+bool isHidden(const SystemRoot& root, Disk& disk, std::string path) {
+    for (;;) {
+        const auto opened = openInRoot(root.descriptor(), path.c_str(), O_PATH | O_DIRECTORY);
+        if (opened || path == "/")
+            return opened && disk.hidesNames(opened->get());
+        const auto slash = path.rfind('/');
+        path.resize(slash == 0 || slash == path.npos ? 0 : slash);
+        if (path.empty())
+            path = "/";
+    }
+}
+
+} // namespace
+
+bool isDanglingSandboxLink(const SystemRoot& root, Disk& disk, int directory, const char* name) {
     char buffer[PATH_MAX];
     const ssize_t bytes = ::readlinkat(directory, name, buffer, sizeof buffer);
     if (bytes < 0 || bytes == sizeof buffer)
@@ -42,7 +67,7 @@ bool isDanglingSandboxLink(const SystemRoot& root, int directory, const char* na
     if (!below.starts_with('/'))
         return true;
     const auto found = openInRoot(root.descriptor(), std::string(below).c_str(), O_PATH | O_NOFOLLOW);
-    return !found && (found.error() == ENOENT || found.error() == ENOTDIR);
+    return !found && (found.error() == ENOENT || found.error() == ENOTDIR) && !isHidden(root, disk, std::string(below));
 }
 
 } // namespace zor::platform

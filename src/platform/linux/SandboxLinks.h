@@ -2,9 +2,12 @@
 // Reading sandbox mappings as they lie on the disk; who sets them is LinkSandboxUserState. Changes nothing. Any thread.
 #pragma once
 
+#include "platform/Disk.h"
 #include "platform/linux/SystemRoot.h"
 
+#include <cstdint>
 #include <functional>
+#include <optional>
 #include <string>
 
 namespace zor::platform {
@@ -15,6 +18,8 @@ struct SandboxDirectory {
     /// Names of directories: numbers, unless somebody else made them.
     std::string user;
     std::string itemType;
+    /// nullopt where the name is no number.
+    [[nodiscard]] std::optional<std::uint32_t> userId() const;
 };
 /// Calls `found` for each directory of mappings. Nothing when there are none; what is no directory is passed over.
 void forEachSandboxDirectory(const SystemRoot& root, const std::function<void(const SandboxDirectory&)>& found);
@@ -23,7 +28,8 @@ void forEachSandboxDirectory(const SystemRoot& root, const std::function<void(co
 [[nodiscard]] inline bool isSandboxLeftover(const std::string& name) {
     return name.starts_with('.');
 }
-/// Whether the link leads to nothing, or out of the root. False when that cannot be known.
-[[nodiscard]] bool isDanglingSandboxLink(const SystemRoot& root, int directory, const char* name);
+/// Whether the link leads to nothing, or out of the root. False when that cannot be known, as where an encryption hides
+/// what it leads to.
+[[nodiscard]] bool isDanglingSandboxLink(const SystemRoot& root, Disk& disk, int directory, const char* name);
 
 } // namespace zor::platform

@@ -44,7 +44,10 @@ std::expected<int, int> XattrProtectionClass::classOf(int fd) const {
 
 std::expected<std::optional<int>, int> XattrProtectionClass::classIn(int fd, const char* attribute) {
     char text[16];
-    const ssize_t bytes = ::fgetxattr(fd, attribute, text, sizeof text);
+    ssize_t bytes = ::fgetxattr(fd, attribute, text, sizeof text);
+    // One that was opened for its path alone is reached by the kernel's link to it.
+    if (bytes < 0 && errno == EBADF && fd >= 0)
+        bytes = ::getxattr(("/proc/self/fd/" + std::to_string(fd)).c_str(), attribute, text, sizeof text);
     if (bytes < 0) {
         if (errno == ENODATA || errno == EOPNOTSUPP)
             return std::nullopt;

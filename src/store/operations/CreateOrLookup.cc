@@ -75,7 +75,16 @@ Result<void> ZORClientConnection::checkRequest(std::uint32_t userId, const std::
 Result<FoundContainer> ZORClientConnection::createOrLookup(std::uint32_t userId, const std::string& identifier,
                                                            ContainerClass containerClass,
                                                            const CreateOrLookupOptions& options) {
+    UserHome* const home = isPerUserClass(containerClass) ? services_.configuration.homeOf(userId) : nullptr;
+    std::uint64_t homeGeneration = home ? home->lookIfDue().generation : 0;
     auto record = services_.cache.containerForUser(userId, containerClass, &identifier, options.transient);
+    if (!record && options.createIfNecessary && home && record.error().is(ErrorCode::notFound)) {
+        const std::uint64_t before = homeGeneration;
+        homeGeneration = home->look().generation;
+        // The home that came meanwhile may have the container.
+        if (homeGeneration != before)
+            record = services_.cache.containerForUser(userId, containerClass, &identifier, options.transient);
+    }
     if (record && !options.transient) {
         (*record)->setExisted(true);
         return snapshot(*record);
@@ -90,7 +99,7 @@ Result<FoundContainer> ZORClientConnection::createOrLookup(std::uint32_t userId,
     // One in the place of another makes the user's share no larger.
     if (!record && !options.replacesAnother)
         TRY(checkShare(userId, identifier));
-    return create(userId, identifier, containerClass, options.transient);
+    return create(userId, identifier, containerClass, options.transient, homeGeneration);
 }
 
 Result<void> ZORClientConnection::checkShare(std::uint32_t userId, const std::string& identifier) {
@@ -118,7 +127,8 @@ Result<void> ZORClientConnection::discardTransient(const ZORMetadata& record, co
 }
 
 Result<FoundContainer> ZORClientConnection::create(std::uint32_t userId, const std::string& identifier,
-                                                   ContainerClass containerClass, bool transient) {
+                                                   ContainerClass containerClass, bool transient,
+                                                   std::uint64_t homeGeneration) {
     constexpr Here here{"createOrLookupContainerForUser", __LINE__};
     const std::string directoryName = UUID::random().string();
     const FileURL staging = services_.configuration.stagingDirectory().appendingDirectory(directoryName);
@@ -140,8 +150,11 @@ Result<FoundContainer> ZORClientConnection::create(std::uint32_t userId, const s
         const std::string* wellKnown = services_.whitelist.wellknownContainerForId(identifier, containerClass);
         const auto moved = [&]() -> Result<void> {
             const auto classDirectory = services_.configuration.openClassDirectory(userId, containerClass, transient);
-            if (!classDirectory)
-                return posixError(here, ENOENT, "user %u has no home", userId);
+            // What was looked for in one home is not made in another.
+            const UserHome* const home =
+                isPerUserClass(containerClass) ? services_.configuration.homeOf(userId) : nullptr;
+            if (!classDirectory || (home && home->generation() != homeGeneration))
+                return posixError(here, ENOENT, "the home of user %u is not there, or has just changed", userId);
             live = classDirectory->url.appendingDirectory(wellKnown ? *wellKnown : directoryName);
             const auto from = services_.fileManager.resolver().openParent(staging);
             if (!from)

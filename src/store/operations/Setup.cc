@@ -223,6 +223,16 @@ std::size_t ZORClientConnection::journalCount() {
     return items ? items->size() : 0;
 }
 
+bool ZORClientConnection::showsContainers(std::uint32_t userId) {
+    UserHome* const home = services_.configuration.homeOf(userId);
+    if (!home)
+        return true;
+    const auto seen = home->look();
+    if (seen.state == UserHome::State::noAccount)
+        return true;
+    return seen.directory && services_.fileManager.itemExistsAtURL(StorePlaces::userBaseDirectory(*seen.directory));
+}
+
 void ZORClientConnection::makeDirectoriesDurable() {
     const FileURL library = services_.configuration.libraryDirectory();
     const auto directory = services_.fileManager.resolver().openDirectory(library);
@@ -244,7 +254,8 @@ void ZORClientConnection::containerManagerSetup() {
     deleteContainersOnDeathRowWithCompletion(nullptr);
     // A stop between the move of a container and its mapping leaves a mapping that points to nothing.
     report.run("dangling mappings", [this] {
-        const unsigned removed = services_.sandbox.removeDanglingMappings();
+        const unsigned removed =
+            services_.sandbox.removeDanglingMappings([this](std::uint32_t userId) { return showsContainers(userId); });
         if (removed != 0)
             services_.log.write(logLevelNotice, launchFunction, "Removed %u sandbox mappings whose container is gone",
                                 removed);

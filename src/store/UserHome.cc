@@ -1,0 +1,93 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "store/UserHome.h"
+
+#include "daemon/base/ZORError.h"
+
+#include <cerrno>
+#include <climits>
+#include <cstdlib>
+#include <ctime>
+
+namespace zor {
+
+using platform::MutexLock;
+
+namespace {
+
+/// How long a home that was there is taken to be there still by who only reads what is cached.
+constexpr std::int64_t lookEveryMilliseconds = 1000;
+
+std::int64_t coarseMilliseconds() {
+    timespec now{};
+    ::clock_gettime(CLOCK_MONOTONIC_COARSE, &now);
+    return std::int64_t{now.tv_sec} * 1000 + now.tv_nsec / 1'000'000;
+}
+
+std::expected<FileURL, int> resolved(const platform::PasswordEntry& entry) {
+    // A home may be reached through links that its administrator made; below it, none is followed.
+    char path[PATH_MAX];
+    if (!::realpath(entry.homeDirectory.c_str(), path))
+        return std::unexpected(errno);
+    return FileURL::directory(path);
+}
+
+} // namespace
+
+std::expected<FileURL, int> UserHome::pathOf(const platform::PasswordDatabase& passwords, std::uint32_t userId) {
+    const auto entry = passwords.entryForUserId(userId);
+    if (!entry)
+        return std::unexpected(entry.error());
+    return resolved(*entry);
+}
+
+UserHome::Found UserHome::find() const {
+    const auto entry = passwords_.entryForUserId(userId_);
+    if (!entry)
+        return {.state = entry.error() == ENOENT ? State::noAccount : State::unknown, .directory = {}, .id = {}};
+    const auto path = resolved(*entry);
+    const auto opened = path ? resolver_.openDirectoryPath(*path) : std::unexpected(path.error());
+    const auto id = opened ? fs::directoryIdOf(opened->get()) : std::unexpected(opened.error());
+    if (!id)
+        return {.state = isOwnShortage(id.error()) ? State::unknown : State::missing, .directory = {}, .id = {}};
+    return {.state = State::present, .directory = *path, .id = *id};
+}
+
+UserHome::Seen UserHome::seenOf(const Found& found) const {
+    return {.state = found.state, .directory = found.directory, .generation = generation()};
+}
+
+UserHome::Seen UserHome::look() {
+    Found before;
+    {
+        const MutexLock held(mutex_);
+        before = found_;
+    }
+    // The database is asked when there is nothing yet, or when what it named has changed.
+    const auto opened = before.directory ? resolver_.openDirectoryPath(*before.directory) : std::unexpected(ENOENT);
+    const auto id = opened ? fs::directoryIdOf(opened->get()) : std::unexpected(opened.error());
+    Found now = id && *id == before.id ? before : find();
+    const MutexLock held(mutex_);
+    dueMilliseconds_ = now.state == State::present ? coarseMilliseconds() + lookEveryMilliseconds : 0;
+    // What could not be looked at leaves what was known.
+    if (now.state == State::unknown)
+        return {.state = State::unknown, .directory = {}, .generation = generation()};
+    if (now != found_) {
+        if (found_.state != State::unknown)
+            log_.write(logLevelNotice, "UserHome", "The home of user %u is now %s", userId_,
+                       now.directory ? now.directory->c_str() : "(null)");
+        found_ = std::move(now);
+        generation_.fetch_add(1, std::memory_order_acq_rel);
+    }
+    return seenOf(found_);
+}
+
+UserHome::Seen UserHome::lookIfDue() {
+    {
+        const MutexLock held(mutex_);
+        if (found_.state == State::present && coarseMilliseconds() < dueMilliseconds_)
+            return seenOf(found_);
+    }
+    return look();
+}
+
+} // namespace zor

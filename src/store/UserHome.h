@@ -1,0 +1,79 @@
+// SPDX-License-Identifier: Apache-2.0
+// The home of one mobile user: where it is, whether it is there, whether it is still the one that it was.
+//
+// Homes come and go while the daemon runs: they are mounted late, unlocked at a login, made for a user who was added.
+// One that does not resolve is none for the moment, and is looked for again at each use. Every change of what was seen
+// gives a new generation, so that who keeps what was read below a home knows whether it still counts.
+//
+// Nothing here makes anything. The disk is asked without a lock; any thread.
+#pragma once
+
+#include "daemon/base/FileURL.h"
+#include "daemon/base/Log.h"
+#include "fs/PathResolver.h"
+#include "platform/Mutex.h"
+#include "platform/Queries.h"
+
+#include <atomic>
+#include <cstdint>
+#include <expected>
+#include <optional>
+
+namespace zor {
+
+class UserHome {
+public:
+    UserHome(std::uint32_t userId, const Log& log, const fs::PathResolver& resolver,
+             const platform::PasswordDatabase& passwords)
+        : userId_(userId), log_(log), resolver_(resolver), passwords_(passwords) {}
+    UserHome(const UserHome&) = delete;
+    UserHome& operator=(const UserHome&) = delete;
+
+    enum class State : std::uint8_t {
+        /// Not to be told for want of descriptors or memory, or because the database could not be asked.
+        unknown,
+        noAccount,
+        missing,
+        present,
+    };
+    struct Seen {
+        State state = State::unknown;
+        /// While it is present: its path, without links.
+        std::optional<FileURL> directory;
+        /// Of what is seen now; never 0.
+        std::uint64_t generation = 0;
+    };
+    /// Asks the disk.
+    Seen look() ZOR_EXCLUDES(mutex_);
+    /// The same, but a home that was seen within the last second is taken to be there still: no system call then.
+    Seen lookIfDue() ZOR_EXCLUDES(mutex_);
+    /// Of the last look; 0 before the first. One atomic read.
+    [[nodiscard]] std::uint64_t generation() const { return generation_.load(std::memory_order_acquire); }
+
+    /// The home that the password database names, without links; the errno when it names none, or one that is not
+    /// there.
+    [[nodiscard]] static std::expected<FileURL, int> pathOf(const platform::PasswordDatabase& passwords,
+                                                            std::uint32_t userId);
+
+private:
+    struct Found {
+        State state = State::unknown;
+        std::optional<FileURL> directory;
+        fs::DirectoryId id;
+        bool operator==(const Found&) const = default;
+    };
+    [[nodiscard]] Found find() const;
+    Seen seenOf(const Found& found) const;
+
+    const std::uint32_t userId_;
+    const Log& log_;
+    const fs::PathResolver& resolver_;
+    const platform::PasswordDatabase& passwords_;
+    std::atomic<std::uint64_t> generation_{0};
+    platform::Mutex mutex_;
+    Found found_ ZOR_GUARDED_BY(mutex_);
+    /// Milliseconds of the coarse monotonic clock.
+    std::int64_t dueMilliseconds_ ZOR_GUARDED_BY(mutex_) = 0;
+};
+
+} // namespace zor
