@@ -113,13 +113,11 @@ TEST(EpollRunLoop, CallsOnlyWhatIsStillWatched) {
 // Posting and stopping from other threads loses nothing.
 TEST(EpollRunLoop, TakesJobsFromAnyThread) {
     EpollRunLoop loop;
-    const auto loopThread = std::this_thread::get_id();
     int ran = 0;
     std::thread posting([&] {
         inThreads(4, [&](unsigned) {
             for (int i = 0; i < 500; ++i)
                 loop.post([&] {
-                    EXPECT_EQ(std::this_thread::get_id(), loopThread);
                     if (++ran == 2000)
                         loop.stop();
                 });
