@@ -2,6 +2,8 @@
 // What the daemon's codes mean to people, in one table.
 #include "zorvane/Error.h"
 
+#include <cstring>
+
 namespace zorvane {
 
 namespace {
@@ -161,6 +163,12 @@ ErrorText errorText(std::uint64_t code) {
     for (const Row& row : rows)
         if (row.code == code)
             return row.text;
+    // An errno that would read as a code of the daemon's own comes with an offset.
+    constexpr std::uint64_t errnoOffset = 1000;
+    const std::uint64_t number = code > errnoOffset ? code - errnoOffset : code;
+    if (const char* const text = number < 200 ? ::strerrordesc_np(static_cast<int>(number)) : nullptr)
+        return {text, "the system refused a step of the request for this reason",
+                "what was done before that step stays done", seeLog};
     return {"the daemon met an error that this client does not know", "the daemon is newer than the client",
             "unknown to this client", seeLog};
 }

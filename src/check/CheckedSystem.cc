@@ -26,7 +26,9 @@ std::expected<std::unique_ptr<CheckedSystem>, std::string> CheckedSystem::open(c
     return std::unique_ptr<CheckedSystem>(new CheckedSystem(std::move(*root)));
 }
 
-CheckedSystem::CheckedSystem(platform::SystemRoot root) : root_(std::move(root)) {}
+CheckedSystem::CheckedSystem(platform::SystemRoot root) : root_(std::move(root)) {
+    places_.fenceMounts(fileManager_);
+}
 
 bool CheckedSystem::daemonRuns() const {
     return platform::DaemonLock::isHeld(root_);

@@ -4,6 +4,7 @@
 #include "check/ShellText.h"
 #include "daemon/base/UserIdentity.h"
 #include "fs/AtomicFile.h"
+#include "fs/ItemStatus.h"
 #include "fs/LeftoverNames.h"
 #include "ipc/Keys.h"
 #include "platform/linux/Names.h"
@@ -18,7 +19,7 @@
 
 namespace zor::check {
 
-using platform::openBeneath;
+using platform::openBeneathOnMount;
 
 namespace {
 
@@ -165,7 +166,7 @@ void ContainerCheck::checkEntry(ClassDirectory& directory, const MetadataReader&
     // One that nobody can judge a boot leaves alone.
     const bool nameAcceptable =
         look_.whitelist().judgeName(name, directory.containerClass) != ZORWhitelist::NameOf::noContainer;
-    const auto opened = openBeneath(directory.descriptor, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
+    const auto opened = openBeneathOnMount(directory.descriptor, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!opened && (opened.error() == ELOOP || opened.error() == ENOTDIR)) {
         checkMisshapen(directory, url, nameAcceptable);
         return;
@@ -193,8 +194,7 @@ void ContainerCheck::checkEntry(ClassDirectory& directory, const MetadataReader&
 void ContainerCheck::checkMisshapen(const ClassDirectory& directory, const FileURL& url, bool nameAcceptable) {
     struct stat status{};
     const std::string name(url.lastPathComponent());
-    const bool isLink =
-        ::fstatat(directory.descriptor, name.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0 && S_ISLNK(status.st_mode);
+    const bool isLink = fs::statusOfName(directory.descriptor, name.c_str(), status) == 0 && S_ISLNK(status.st_mode);
     const std::string what =
         isLink ? "is a link where only containers belong" : "is no directory where only containers belong";
     // A boot removes what has another name than containers have; what has one it leaves, for it cannot look inside.
@@ -215,9 +215,9 @@ std::shared_ptr<ZORMetadata> ContainerCheck::readRecord(const ClassDirectory& di
         return nullptr;
     }
     struct stat status{};
-    if (::fstatat(container, names::metadataFile, &status, AT_SYMLINK_NOFOLLOW) != 0 && errno == ENOENT) {
+    if (fs::statusOfName(container, names::metadataFile, status) == ENOENT) {
         // One that has gone altogether was read a moment too late.
-        if (::fstatat(directory.descriptor, name, &status, AT_SYMLINK_NOFOLLOW) == 0) {
+        if (fs::statusOfName(directory.descriptor, name, status) == 0) {
             const FileURL url = directory.url.appendingDirectory(name);
             constexpr const char* what = "has no metadata file";
             Finding& finding =
@@ -350,7 +350,7 @@ void ContainerCheck::checkOwnDirectory(const Container& container, const Contain
 bool ContainerCheck::checkSubdirectory(const Container& container, const ContainerLayout& layout,
                                        const char* subdirectory) {
     const FileURL url = container.url.appendingDirectory(subdirectory);
-    const auto item = openBeneath(container.descriptor, subdirectory, O_PATH | O_NOFOLLOW);
+    const auto item = openBeneathOnMount(container.descriptor, subdirectory, O_PATH | O_NOFOLLOW);
     struct stat status{};
     const int error = !item ? item.error() : ::fstat(item->get(), &status) != 0 ? errno : 0;
     if (error == ENOENT) {
@@ -394,7 +394,7 @@ void ContainerCheck::checkProtection(const Container& container, const char* sub
         container.record->info() ? container.record->info()->find(ipc::infoKeys::contentProtectionClass) : nullptr;
     const auto number = value ? value->asSigned() : std::nullopt;
     const std::int64_t recorded = number.value_or(platform::defaultProtectionClass);
-    const auto directory = openBeneath(descriptor, ".", O_RDONLY | O_DIRECTORY);
+    const auto directory = openBeneathOnMount(descriptor, ".", O_RDONLY | O_DIRECTORY);
     const auto found =
         directory ? look_.device().protection().classOf(directory->get()) : std::unexpected(directory.error());
     if (!found || *found == recorded || *found == protectionClassKept)
@@ -423,9 +423,8 @@ void ContainerCheck::checkNamesInside(const Container& container, const Containe
                                               [&](const char* final) { return fs::isDirectoryLeftover(text, final); });
         struct stat status{};
         // Programs have such names too; one that still is the daemon's own was not given away.
-        if (!half || ::fstatat(container.descriptor, name, &status, AT_SYMLINK_NOFOLLOW) != 0 ||
-            !S_ISDIR(status.st_mode) || status.st_uid != ::geteuid() ||
-            (layout.subdirectoryOwner == status.st_uid && look_.device().ownersCount()))
+        if (!half || fs::statusOfName(container.descriptor, name, status) != 0 || !S_ISDIR(status.st_mode) ||
+            status.st_uid != ::geteuid() || (layout.subdirectoryOwner == status.st_uid && look_.device().ownersCount()))
             return;
         describe(addDirectoryLeftover(container.url, text), container);
     });

@@ -21,9 +21,12 @@ Look::Look(CheckedSystem& system, const CheckOptions& options)
 
 void Look::addUser(std::uint32_t userId) {
     const auto entry = system_.passwords().entryForUserId(userId);
-    auto home = UserHome::pathOf(system_.passwords(), userId);
+    fs::BoundedQuestion wayToHome;
+    auto home = UserHome::pathOf(system_.passwords(), userId, wayToHome);
     const FileURL looked = entry ? FileURL::directory(home ? home->path() : entry->homeDirectory)
                                  : FileURL::file(system_.root().path(platform::names::passwordFile));
+    if (home)
+        system_.fileManager().resolver().fence(*home, fs::MountFence::Kind::home);
     struct stat status{};
     const int error = home ? system_.fileManager().resolver().status(*home, status) : home.error();
     if (error == ENOENT && entry)

@@ -125,8 +125,10 @@ void WorkCheck::checkMappings() {
             }
             // A home that is not there comes back with its containers.
             if ((user && look_.lacksHome(*user)) ||
-                !platform::isDanglingSandboxLink(root, look_.device().fileManager().disk(), directory.descriptor,
-                                                 name.c_str()))
+                !platform::isDanglingSandboxLink(
+                    root, directory.descriptor, name.c_str(), [this](const std::string& path) {
+                        return look_.device().fileManager().itemIsGone(FileURL::directory(path));
+                    }))
                 continue;
             Finding& finding = look_.add(FindingCode::mappingDangling, url.appendingFile(name),
                                          "is a sandbox mapping that leads to no container", Mender::launch);

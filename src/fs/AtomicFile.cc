@@ -56,7 +56,7 @@ int writeNewFile(platform::Disk& disk, int directory, const char* name, mode_t m
 }
 
 int replaceFileDurably(platform::Disk& disk, int directory, const std::string& name, mode_t mode,
-                       std::span<const std::uint8_t> bytes) {
+                       std::span<const std::uint8_t> bytes, const std::function<int(int file)>& prepare) {
     const std::string prefix = "." + name + std::string(temporaryMark);
     std::string temporary = prefix + std::string(usualSuffix);
     int descriptor = writeNewFile(disk, directory, temporary.c_str(), mode, bytes);
@@ -68,7 +68,11 @@ int replaceFileDurably(platform::Disk& disk, int directory, const std::string& n
         descriptor = writeNewFile(disk, directory, temporary.c_str(), mode, bytes);
     }
     const FileDescriptor file(descriptor < 0 ? -1 : descriptor);
-    int status = descriptor < 0 ? descriptor : disk.sync(file.get());
+    int status = descriptor < 0 ? descriptor : 0;
+    if (status == 0 && prepare)
+        status = prepare(file.get());
+    if (status == 0)
+        status = disk.sync(file.get());
     if (status == 0)
         status = disk.rename(directory, temporary.c_str(), directory, name.c_str(), 0);
     if (status < 0) {

@@ -10,6 +10,7 @@
 #include "platform/Disk.h"
 
 #include <cstdint>
+#include <functional>
 #include <span>
 #include <string>
 #include <string_view>
@@ -18,9 +19,11 @@
 namespace zor::fs {
 
 /// 0, or a negative errno with the target untouched (unless only the last directory sync failed).
-/// `mode` is set whatever the process's mask; the file belongs to the daemon.
+/// `mode` is set whatever the process's mask; the file belongs to the daemon. `prepare` does more to the new file
+/// before it is synced: 0 or a negative errno.
 [[nodiscard]] int replaceFileDurably(platform::Disk& disk, int directory, const std::string& name, mode_t mode,
-                                     std::span<const std::uint8_t> bytes);
+                                     std::span<const std::uint8_t> bytes,
+                                     const std::function<int(int file)>& prepare = nullptr);
 
 /// Whether a file of this name is what a write that was cut short left.
 [[nodiscard]] bool isWriteLeftover(std::string_view name);

@@ -25,7 +25,9 @@ Result<void> writeToURL(const plist::Dictionary& dictionary, const FileURL& url,
                           url.c_str(), bytes->size(), bytesMax);
     const auto parent = fileManager.resolver().openParent(url);
     const int status =
-        parent ? fs::replaceFileDurably(fileManager.disk(), parent->directory.get(), parent->name, 0644, *bytes)
+        parent ? fs::replaceFileDurably(
+                     fileManager.disk(), parent->directory.get(), parent->name, 0644, *bytes,
+                     [&](int file) { return -fileManager.setClassAtCreation(file, classWithoutProtection); })
                : -parent.error();
     if (status < 0)
         return posixError(ZOR_HERE, -status, "write of %s failed: %s", url.c_str(), errorText(-status));

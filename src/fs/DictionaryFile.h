@@ -15,6 +15,8 @@ namespace zor {
 /// How a property-list file is written. The numbers are part of the store's form.
 inline constexpr std::uint32_t writeAtomically = 0x1;
 inline constexpr std::uint32_t writeWithoutProtection = 0x10000000;
+/// The data-protection class of what is written without protection: it can be read while the device is locked.
+inline constexpr int classWithoutProtection = 4;
 
 /// Serialises as a binary property list and writes it, 0644 and the daemon's own; POSIX error with the previous file
 /// untouched. Both options are what every caller wants; others are not offered. EFBIG, before anything is written, for

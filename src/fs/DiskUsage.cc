@@ -4,6 +4,7 @@
 #include "daemon/base/Log.h"
 #include "daemon/base/ZORError.h"
 #include "fs/BulkDirectoryRead.h"
+#include "fs/ItemStatus.h"
 #include "fs/TreeWalker.h"
 #include "platform/linux/Openat2.h"
 
@@ -145,9 +146,9 @@ void Measurement::measureEntries(int directory, const std::string& path) {
         struct stat status{};
         if (entry->type == DT_DIR && !traits_.emptyDirectoryBytes) {
             addDirectory(directory, path, entry->name);
-        } else if (::fstatat(directory, entry->name, &status, AT_SYMLINK_NOFOLLOW) != 0) {
-            sayUnexamined(path, index, errno);
-        } else if (status.st_dev != device_) {
+        } else if (const int error = statusOfName(directory, entry->name, status); error != 0 && error != EXDEV) {
+            sayUnexamined(path, index, error);
+        } else if (error == EXDEV || status.st_dev != device_) {
             continue;
         } else if (!S_ISDIR(status.st_mode)) {
             addNonDirectory(status, [&] { return joined(path, entry->name); });

@@ -24,7 +24,7 @@ std::optional<FileURL> hiddenBy(const PathResolver& resolver, platform::Disk& di
 }
 
 bool hidesNamesBelow(platform::Disk& disk, int directory, const char* name) {
-    const auto below = platform::openBeneath(directory, name, O_PATH | O_DIRECTORY | O_NOFOLLOW);
+    const auto below = platform::openBeneathOnMount(directory, name, O_PATH | O_DIRECTORY | O_NOFOLLOW);
     return below && disk.hidesNames(below->get());
 }
 

@@ -24,7 +24,7 @@ int judge(const struct stat& status, std::size_t bytesMax, std::optional<uid_t> 
 
 std::expected<plist::Data, int> readOwnedFile(int directory, const char* path, std::size_t bytesMax,
                                               std::optional<uid_t> formerOwner) {
-    const auto file = platform::openBeneath(directory, path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
+    const auto file = platform::openBeneathOnMount(directory, path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
     if (!file)
         return std::unexpected(file.error());
     struct stat status{};

@@ -35,11 +35,37 @@ const char* PathResolver::relative(const FileURL& url) const {
     return path[root.size()] == '/' ? path.c_str() + root.size() + 1 : nullptr;
 }
 
+void PathResolver::fence(const FileURL& url, MountFence::Kind kind) const {
+    const char* const path = relative(url);
+    if (path && std::string_view(path) != ".")
+        fences_.add(path, kind);
+}
+
+bool PathResolver::answers(const FileURL& url) const {
+    const char* const path = relative(url);
+    MountFence* const fence = path ? fences_.around(path) : nullptr;
+    const bool answered = !fence || fence->answers();
+    if (!answered)
+        noteLeft(url, EHOSTDOWN);
+    return answered;
+}
+
+void PathResolver::noteLeft(const FileURL& url, int error) const {
+    if (left_ && (error == EXDEV || error == EHOSTDOWN))
+        left_(url, error);
+}
+
 OpenResult PathResolver::openItem(const FileURL& url, int flags) const {
     const char* path = relative(url);
     if (!path)
         return std::unexpected(EXDEV);
-    return openBeneath(root_.descriptor(), path, flags | O_NOFOLLOW);
+    MountFence* const fence = fences_.around(path);
+    if (!fence)
+        return openBeneath(root_.descriptor(), path, flags | O_NOFOLLOW);
+    OpenResult opened = fence->open(path, flags | O_NOFOLLOW);
+    if (!opened)
+        noteLeft(url, opened.error());
+    return opened;
 }
 
 OpenResult PathResolver::openDirectory(const FileURL& url) const {
@@ -58,15 +84,51 @@ std::expected<ParentAndName, int> PathResolver::openParent(const FileURL& url) c
 }
 
 int PathResolver::status(const FileURL& url, struct stat& status) const {
+    const char* path = relative(url);
+    if (!path)
+        return EXDEV;
+    if (MountFence* const fence = fences_.around(path)) {
+        const int error = fence->status(path, status);
+        noteLeft(url, error);
+        return error;
+    }
     const auto parent = openParent(url);
     if (!parent)
         return parent.error();
     return ::fstatat(parent->directory.get(), parent->name.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0 ? 0 : errno;
 }
 
-OpenResult makeDirectories(platform::Disk& disk, int base, std::string_view relativePath, mode_t mode) {
+std::expected<PathResolver::Way, int> PathResolver::wayTo(const FileURL& url) const {
+    const char* const path = relative(url);
+    if (!path)
+        return std::unexpected(EXDEV);
+    MountFence* const fence = fences_.around(path);
+    const std::string_view whole(path);
+    const std::size_t own = fence ? fence->ownBytes(whole) : whole.size();
+    if (own == whole.size() && (!fence || !fence->isHome()))
+        return Way{.fence = {}, .base = root_.descriptor(), .path = path, .mounts = Mounts::crossed};
+    OpenResult base = fence->open(std::string(whole.substr(0, own)).c_str(), O_PATH | O_DIRECTORY);
+    if (!base) {
+        noteLeft(url, base.error());
+        return std::unexpected(base.error());
+    }
+    const int descriptor = base->get();
+    const std::string_view rest = whole.substr(own);
+    const std::size_t begin = rest.find_first_not_of('/');
+    return Way{.fence = std::move(*base),
+               .base = descriptor,
+               .path = begin == rest.npos ? "." : std::string(rest.substr(begin)),
+               .mounts = Mounts::left};
+}
+
+OpenResult openBelow(int base, const char* path, int flags, Mounts mounts) {
+    return mounts == Mounts::crossed ? openBeneath(base, path, flags) : platform::openBeneathOnMount(base, path, flags);
+}
+
+OpenResult makeDirectories(platform::Disk& disk, int base, std::string_view relativePath, mode_t mode, Mounts mounts) {
+    constexpr int flags = O_PATH | O_DIRECTORY | O_NOFOLLOW;
     const std::string whole(relativePath.empty() ? "." : relativePath);
-    OpenResult current = openBeneath(base, whole.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
+    OpenResult current = openBelow(base, whole.c_str(), flags, mounts);
     if (current || current.error() != ENOENT)
         return current;
     current = openBeneath(base, ".", O_PATH | O_DIRECTORY);
@@ -76,12 +138,12 @@ OpenResult makeDirectories(platform::Disk& disk, int base, std::string_view rela
         begin = end + 1;
         if (component.empty())
             continue;
-        OpenResult below = openBeneath(current->get(), component.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
+        OpenResult below = openBelow(current->get(), component.c_str(), flags, mounts);
         if (!below && below.error() == ENOENT) {
             const int made = disk.makeDirectory(current->get(), component.c_str(), mode);
             if (made < 0 && made != -EEXIST)
                 return std::unexpected(-made);
-            below = openBeneath(current->get(), component.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
+            below = openBelow(current->get(), component.c_str(), flags, mounts);
         }
         current = std::move(below);
     }

@@ -3,17 +3,19 @@
 //
 // Below a user's home every name can change between two system calls. So a path is resolved once, from the open root,
 // in one openat2 that follows no link and leaves no root; what comes after acts on the descriptor. A path outside the
-// root, a link on the way, or a "..", is an error, never a detour. All functions return a descriptor or an errno. Any
-// thread.
+// root, a link on the way, or a "..", is an error, never a detour. Below a fence (fs/MountFences.h) a mount point on
+// the way is one too: EXDEV, and EHOSTDOWN where the file system of a home does not answer. All functions return a
+// descriptor or an errno. Any thread.
 #pragma once
 
 #include "daemon/base/FileURL.h"
+#include "fs/MountFences.h"
 #include "platform/Disk.h"
 #include "platform/FileDescriptor.h"
 #include "platform/linux/SystemRoot.h"
 
 #include <cstdint>
-#include <expected>
+#include <functional>
 #include <string>
 #include <string_view>
 #include <sys/stat.h>
@@ -21,7 +23,9 @@
 namespace zor::fs {
 
 using platform::FileDescriptor;
-using OpenResult = std::expected<FileDescriptor, int>;
+
+/// Whether a step may lead onto another mount.
+enum class Mounts { crossed, left };
 
 /// An open directory and the name of one item in it.
 struct ParentAndName {
@@ -41,7 +45,17 @@ struct DirectoryId {
 
 class PathResolver {
 public:
-    explicit PathResolver(const platform::SystemRoot& root) : root_(root) {}
+    /// Told a path that was not entered, and why. Any thread; may throw nothing.
+    using Left = std::function<void(const FileURL& url, int error)>;
+    explicit PathResolver(const platform::SystemRoot& root, Left left = nullptr)
+        : root_(root), fences_(root.descriptor()), left_(std::move(left)) {}
+    PathResolver(const PathResolver&) = delete;
+    PathResolver& operator=(const PathResolver&) = delete;
+
+    /// From now on no mount is crossed below this directory (see MountFence::Kind).
+    void fence(const FileURL& url, MountFence::Kind kind) const;
+    /// Whether the home that holds the item answers; see MountFence::answers.
+    [[nodiscard]] bool answers(const FileURL& url) const;
 
     /// For reading its entries and for acting on it.
     [[nodiscard]] OpenResult openDirectory(const FileURL& url) const;
@@ -52,17 +66,32 @@ public:
     [[nodiscard]] std::expected<ParentAndName, int> openParent(const FileURL& url) const;
     /// lstat: 0 or an errno.
     [[nodiscard]] int status(const FileURL& url, struct stat& status) const;
+    /// Where a path begins for who makes what is missing on it: at its fence, which has to be there, or at the root.
+    struct Way {
+        FileDescriptor fence;
+        int base = -1;
+        std::string path; ///< relative to `base`
+        Mounts mounts = Mounts::left;
+    };
+    [[nodiscard]] std::expected<Way, int> wayTo(const FileURL& url) const;
     /// The path relative to the root ("." for the root itself); nullptr when it lies outside.
     [[nodiscard]] const char* relative(const FileURL& url) const;
 
     [[nodiscard]] const platform::SystemRoot& root() const { return root_; }
 
 private:
+    void noteLeft(const FileURL& url, int error) const;
+
     const platform::SystemRoot& root_;
+    mutable MountFences fences_; // knows no more of the disk than before
+    const Left left_;
 };
 
+/// Opens what lies at a relative path, without following a link.
+[[nodiscard]] OpenResult openBelow(int base, const char* path, int flags, Mounts mounts);
 /// Opens a directory below an open one (O_PATH; "" is that one itself), making each missing one on the way, of `mode`
 /// before the process's mask.
-[[nodiscard]] OpenResult makeDirectories(platform::Disk& disk, int base, std::string_view relativePath, mode_t mode);
+[[nodiscard]] OpenResult makeDirectories(platform::Disk& disk, int base, std::string_view relativePath, mode_t mode,
+                                         Mounts mounts);
 
 } // namespace zor::fs

@@ -191,8 +191,7 @@ int Copier::endDirectory(const WalkEntry& entry) {
 
 int Copier::copyFile(const WalkEntry& entry) {
     constexpr int flags = O_RDONLY | O_NONBLOCK | O_NOCTTY | O_NOFOLLOW;
-    const auto source = entry.depth == 0 ? platform::openBeneath(entry.parent, entry.name, flags)
-                                         : platform::openBeneathOnMount(entry.parent, entry.name, flags);
+    const auto source = platform::openBeneathOnMount(entry.parent, entry.name, flags);
     if (!source)
         return source.error() == ENOENT && entry.depth > 0 ? 0 : -source.error();
     struct stat status{};

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/RecursiveRemove.h"
 
+#include "fs/ItemStatus.h"
 #include "fs/TreeWalker.h"
 #include "platform/linux/Openat2.h"
 
@@ -133,7 +134,7 @@ WalkStep Remover::failed(const WalkEntry& entry, int error) {
         return WalkStep::stop;
     }
     struct stat status{};
-    const bool repaired = ::fstatat(entry.parent, entry.name, &status, AT_SYMLINK_NOFOLLOW) != 0 && errno == ENOENT;
+    const bool repaired = statusOfName(entry.parent, entry.name, status) == ENOENT;
     if (!repaired)
         doomedDepth_ = std::max(doomedDepth_, static_cast<long>(entry.depth) - 1);
     return WalkStep::proceed;
@@ -159,8 +160,8 @@ bool Remover::makeMutable(int directory, const std::string& path) {
 bool Remover::stillNamed(const WalkEntry& entry) {
     struct stat named{};
     struct stat opened{};
-    return ::fstatat(entry.parent, entry.name, &named, AT_SYMLINK_NOFOLLOW) == 0 &&
-           ::fstat(entry.directory, &opened) == 0 && named.st_dev == opened.st_dev && named.st_ino == opened.st_ino;
+    return statusOfName(entry.parent, entry.name, named) == 0 && ::fstat(entry.directory, &opened) == 0 &&
+           named.st_dev == opened.st_dev && named.st_ino == opened.st_ino;
 }
 
 } // namespace
@@ -184,8 +185,8 @@ int removeTree(platform::Disk& disk, int directory, const char* name) {
 int clearImmutable(platform::Disk& disk, int directory, const char* name) {
     // Only files and directories have inode flags; the same request to a device's driver could mean anything.
     struct stat status{};
-    if (::fstatat(directory, name, &status, AT_SYMLINK_NOFOLLOW) != 0)
-        return -errno;
+    if (const int error = statusOfName(directory, name, status))
+        return -error;
     if (!S_ISREG(status.st_mode) && !S_ISDIR(status.st_mode))
         return 0;
     const auto item = platform::openBeneathOnMount(directory, name, O_RDONLY | O_NONBLOCK | O_NOCTTY | O_NOFOLLOW);

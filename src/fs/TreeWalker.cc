@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/TreeWalker.h"
 
+#include "fs/ItemStatus.h"
 #include "platform/linux/Openat2.h"
 
 #include <cerrno>
@@ -60,9 +61,11 @@ int TreeWalker::walk(int parent, const char* name, const Visitor& visitor) {
 
 WalkStep TreeWalker::visitRoot() {
     WalkEntry entry{.parent = rootParent_, .name = rootName_.c_str(), .stack = &stack_};
-    // The root may be a mount point itself: its file system is the walk's, whichever that is.
-    if (::fstatat(rootParent_, entry.name, &entry.status, AT_SYMLINK_NOFOLLOW) != 0) {
-        rootError_ = errno;
+    const int error = statusOfName(rootParent_, entry.name, entry.status);
+    if (error == EXDEV)
+        return visitMountPoint(entry);
+    if (error != 0) {
+        rootError_ = error;
         return WalkStep::proceed;
     }
     device_ = entry.status.st_dev;
@@ -73,8 +76,11 @@ WalkStep TreeWalker::visitName(WalkEntry entry, unsigned char type) {
     for (int change = 0;; ++change) {
         if (type != DT_DIR) {
             if (type == DT_UNKNOWN || statusWanted_ == WalkStatus::full) {
-                if (::fstatat(entry.parent, entry.name, &entry.status, AT_SYMLINK_NOFOLLOW) != 0) {
-                    entry.error = errno;
+                const int error = statusOfName(entry.parent, entry.name, entry.status);
+                if (error == EXDEV)
+                    return visitMountPoint(entry);
+                if (error != 0) {
+                    entry.error = error;
                     if (entry.depth == 0)
                         rootError_ = entry.error;
                     else if (entry.error != ENOENT)
@@ -85,8 +91,7 @@ WalkStep TreeWalker::visitName(WalkEntry entry, unsigned char type) {
             if (!S_ISDIR(entry.status.st_mode))
                 return visitNonDirectory(entry);
         }
-        auto directory = atRoot() ? platform::openBeneath(entry.parent, entry.name, directoryFlags)
-                                  : platform::openBeneathOnMount(entry.parent, entry.name, directoryFlags);
+        auto directory = platform::openBeneathOnMount(entry.parent, entry.name, directoryFlags);
         if (directory)
             return visitDirectory(entry, std::move(*directory));
         const int error = directory.error();
@@ -100,7 +105,6 @@ WalkStep TreeWalker::visitName(WalkEntry entry, unsigned char type) {
 
 WalkStep TreeWalker::visitNonDirectory(WalkEntry& entry) {
     entry.kind = kindOf(entry.status.st_mode);
-    // A mount on a file shows only in a status that was asked for.
     entry.onOtherFileSystem = statusWanted_ == WalkStatus::full && entry.status.st_dev != device_;
     return (*visitor_)(entry);
 }
@@ -125,9 +129,14 @@ WalkStep TreeWalker::visitDirectory(WalkEntry& entry, FileDescriptor directory) 
 }
 
 WalkStep TreeWalker::visitMountPoint(WalkEntry& entry) {
+    const mode_t type = entry.status.st_mode & S_IFMT;
     entry.status = {};
-    entry.status.st_mode = S_IFDIR;
+    entry.status.st_mode = type == 0 ? mode_t{S_IFDIR} : type;
     entry.onOtherFileSystem = true;
+    if (!S_ISDIR(entry.status.st_mode)) {
+        entry.kind = kindOf(type);
+        return (*visitor_)(entry);
+    }
     entry.kind = WalkEntryKind::directory;
     if (const WalkStep step = (*visitor_)(entry); step == WalkStep::stop)
         return step;
@@ -138,8 +147,7 @@ WalkStep TreeWalker::visitMountPoint(WalkEntry& entry) {
 WalkStep TreeWalker::visitUnopened(WalkEntry& entry, int error) {
     if (error == EXDEV)
         return visitMountPoint(entry);
-    if (statusWanted_ == WalkStatus::full &&
-        ::fstatat(entry.parent, entry.name, &entry.status, AT_SYMLINK_NOFOLLOW) != 0 && errno == ENOENT)
+    if (statusWanted_ == WalkStatus::full && statusOfName(entry.parent, entry.name, entry.status) == ENOENT)
         return WalkStep::proceed;
     entry.kind = WalkEntryKind::directory;
     if (const WalkStep step = (*visitor_)(entry); step == WalkStep::stop)

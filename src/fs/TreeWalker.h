@@ -4,7 +4,8 @@
 // The trees belong to others, who change them while they are walked. So every step starts from a directory that is
 // open; a name that is gone when its turn comes counts as never having been there; a name that became something else is
 // visited as what it is now. A directory is visited before and after its content. A mount point, or a subvolume, is
-// visited before and after but not entered, and nothing of what lies on it is asked.
+// visited before and after but not entered, and nothing of what lies on it is asked; that holds for the root of the
+// walk too, unless it is ".". Where only types are wanted, a mount on a file is shown as the file.
 //
 // Any depth and any width: fewer than DirectoryStack::openMax + 8 descriptors, no recursion, and memory that grows with
 // the length of the current path alone. A directory whose descriptor had to be closed is found again by ".." and must

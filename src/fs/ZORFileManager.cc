@@ -5,6 +5,7 @@
 #include "fs/AtomicFile.h"
 #include "fs/FreshDirectory.h"
 #include "fs/Hidden.h"
+#include "fs/ItemStatus.h"
 #include "platform/linux/Openat2.h"
 
 #include <cerrno>
@@ -13,25 +14,29 @@
 
 namespace zor {
 
+using fs::Mounts;
 using fs::uniqueName;
 using platform::FileDescriptor;
-using platform::openBeneath;
+using platform::openBeneathOnMount;
 
 namespace {
 
 constexpr int namesTriedMax = 16;
+/// Users can mount in any number of places; behind these the log has said enough.
+constexpr std::size_t leftSaidMax = 200;
 constexpr mode_t closedMode = 0700;
 constexpr mode_t permissionBits = 07777;
 
 /// lstat: 0 or an errno.
-int statusBelow(int base, const std::string& relativePath, struct stat& status) {
+int statusBelow(int base, const std::string& relativePath, Mounts mounts, struct stat& status) {
     const std::size_t slash = relativePath.rfind('/');
     const std::string above = slash == relativePath.npos ? "." : relativePath.substr(0, slash);
-    const auto parent = openBeneath(base, above.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
+    const auto parent = fs::openBelow(base, above.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW, mounts);
     if (!parent)
         return parent.error();
     const char* const name = relativePath.c_str() + (slash == relativePath.npos ? 0 : slash + 1);
-    return ::fstatat(parent->get(), name, &status, AT_SYMLINK_NOFOLLOW) == 0 ? 0 : errno;
+    const int error = fs::statusOfName(parent->get(), name, status);
+    return error == EXDEV && mounts == Mounts::crossed ? 0 : error;
 }
 
 /// The call in messages.
@@ -41,6 +46,17 @@ const char* makingVerb(Intermediates intermediates) {
 
 } // namespace
 
+void ZORFileManager::sayLeft(const std::string& path, int error) {
+    {
+        const platform::MutexLock held(saidMutex_);
+        if (saidLeft_.size() >= leftSaidMax || !saidLeft_.insert(path).second)
+            return;
+    }
+    log_.write(logLevelError, __func__, "Leaving %s: %s", ZOR_SHOWN(path),
+               error == EXDEV ? "a file system that a user may have mounted is in the way"
+                              : "the file system of the home does not answer");
+}
+
 Result<void> ZORFileManager::createDirectoryAtURL(const FileURL& url, Intermediates intermediates,
                                                   const DirectoryAttributes& attributes) {
     TRY(openOrCreateDirectoryAtURL(url, intermediates, attributes));
@@ -49,32 +65,35 @@ Result<void> ZORFileManager::createDirectoryAtURL(const FileURL& url, Intermedia
 
 Result<FileDescriptor> ZORFileManager::openOrCreateDirectoryAtURL(const FileURL& url, Intermediates intermediates,
                                                                   const DirectoryAttributes& attributes) {
-    const char* const path = resolver_.relative(url);
-    if (!path)
-        return posixError(ZOR_HERE, EXDEV, "Failed to determine if %s exists: %s", url.c_str(), errorText(EXDEV));
-    return openOrCreate(resolver_.root().descriptor(), path, url, intermediates, attributes);
+    const auto way = resolver_.wayTo(url);
+    if (!way)
+        return posixError(ZOR_HERE, way.error(), "Failed to determine if %s exists: %s", url.c_str(),
+                          errorText(way.error()));
+    return openOrCreate({.directory = way->base, .mounts = way->mounts}, way->path, url, intermediates, attributes);
 }
 
 Result<FileDescriptor> ZORFileManager::openOrCreateDirectoryBelow(int base, const FileURL& baseUrl,
                                                                   const std::string& relativePath,
                                                                   Intermediates intermediates,
                                                                   const DirectoryAttributes& attributes) {
-    return openOrCreate(base, relativePath, baseUrl.appendingDirectory(relativePath), intermediates, attributes);
+    return openOrCreate({.directory = base, .mounts = Mounts::left, .isUsers = true}, relativePath,
+                        baseUrl.appendingDirectory(relativePath), intermediates, attributes);
 }
 
-Result<FileDescriptor> ZORFileManager::openOrCreate(int base, const std::string& relativePath, const FileURL& url,
-                                                    Intermediates intermediates,
+Result<FileDescriptor> ZORFileManager::openOrCreate(const Base& base, const std::string& relativePath,
+                                                    const FileURL& url, Intermediates intermediates,
                                                     const DirectoryAttributes& attributes) {
     // A class can be set on a descriptor only that was opened for reading.
     const int access = attributes.protectionClass == protectionClassUnchanged ? O_PATH : O_RDONLY;
-    auto existing = openBeneath(base, relativePath.c_str(), access | O_DIRECTORY | O_NOFOLLOW);
+    auto existing = fs::openBelow(base.directory, relativePath.c_str(), access | O_DIRECTORY | O_NOFOLLOW, base.mounts);
     if (!existing && existing.error() == ENOENT)
         return makeNewDirectory(base, relativePath, url, intermediates, attributes);
     if (!existing) {
         constexpr Here here{"createDirectoryAtURL", __LINE__};
         struct stat status{};
         const bool misshapen = existing.error() == ELOOP || existing.error() == ENOTDIR;
-        const int failure = misshapen ? statusBelow(base, relativePath, status) : existing.error();
+        const int failure =
+            misshapen ? statusBelow(base.directory, relativePath, base.mounts, status) : existing.error();
         if (failure != 0)
             return posixError(here, failure, "Failed to determine if %s exists: %s", url.c_str(), errorText(failure));
         // It is there: a link, or a file.
@@ -139,19 +158,19 @@ Result<void> ZORFileManager::mendDirectory(int directory, const FileURL& url, co
     return {};
 }
 
-Result<FileDescriptor> ZORFileManager::makeNewDirectory(int base, std::string_view relativePath, const FileURL& url,
-                                                        Intermediates intermediates,
+Result<FileDescriptor> ZORFileManager::makeNewDirectory(const Base& base, std::string_view relativePath,
+                                                        const FileURL& url, Intermediates intermediates,
                                                         const DirectoryAttributes& attributes) {
     const FileURL parentUrl = url.deletingLastPathComponent();
     const std::size_t slash = relativePath.rfind('/');
     const std::string way(slash == relativePath.npos ? "." : relativePath.substr(0, slash));
     const auto parent = intermediates == Intermediates::yes
-                            ? fs::makeDirectories(disk_, base, way, attributes.intermediateMode)
-                            : openBeneath(base, way.c_str(), O_PATH | O_DIRECTORY);
+                            ? fs::makeDirectories(disk_, base.directory, way, attributes.intermediateMode, base.mounts)
+                            : fs::openBelow(base.directory, way.c_str(), O_PATH | O_DIRECTORY, base.mounts);
     // Below a user's directory the daemon's own levels are open to all; what is closed, or another's, was named so.
     struct stat above{};
-    if (parent && base != resolver_.root().descriptor() && ::fstat(parent->get(), &above) == 0 &&
-        above.st_uid != ownerToBe(attributes.owner) && (above.st_uid != daemon_ || (above.st_mode & S_IXOTH) == 0))
+    if (parent && base.isUsers && ::fstat(parent->get(), &above) == 0 && above.st_uid != ownerToBe(attributes.owner) &&
+        (above.st_uid != daemon_ || (above.st_mode & S_IXOTH) == 0))
         return posixError(ZOR_HERE, EPERM, "%s belongs to user %u, so nothing is made in it; move it away",
                           parentUrl.c_str(), above.st_uid);
     const std::string finalName(url.lastPathComponent());
@@ -168,7 +187,7 @@ Result<FileDescriptor> ZORFileManager::makeNewDirectory(int base, std::string_vi
     if (made < 0)
         return posixError(ZOR_HERE, -made, "%s of %s failed: %s", makingVerb(intermediates), temporaryPath.c_str(),
                           errorText(-made));
-    auto directory = openBeneath(parent->get(), name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
+    auto directory = openBeneathOnMount(parent->get(), name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!directory)
         return posixError(ZOR_HERE, directory.error(), "opendir of %s failed: %s", temporaryPath.c_str(),
                           errorText(directory.error()));
@@ -258,8 +277,14 @@ bool ZORFileManager::itemDoesNotExistAtURL(const FileURL& url) {
     return failure == ENOENT && !hidden;
 }
 
+bool ZORFileManager::itemIsGone(const FileURL& url) const {
+    struct stat status{};
+    const int failure = resolver_.status(url, status);
+    return failure == ENOTDIR || (failure == ENOENT && !fs::hiddenBy(resolver_, disk_, url));
+}
+
 bool ZORFileManager::itemDoesNotExistBelow(int directory, const char* relativePath, const FileURL& url) {
-    const auto item = openBeneath(directory, relativePath, O_PATH | O_NOFOLLOW);
+    const auto item = openBeneathOnMount(directory, relativePath, O_PATH | O_NOFOLLOW);
     int failure = item ? 0 : item.error();
     const std::string_view path = relativePath;
     if (failure == ENOENT &&
@@ -295,10 +320,11 @@ Result<void> ZORFileManager::setDataProtectionClassOfEntry(
     if (entry.directory >= 0)
         return setClassOf(entry.directory, path, protectionClass,
                           [&](int current) { return predicate(entry.status, current); });
-    auto item = platform::openBeneathOnMount(entry.parent, entry.name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
-    // Its class is beside its content, which alone is encrypted: it needs no key.
-    if (!item && item.error() == ENOKEY)
-        item = platform::openBeneathOnMount(entry.parent, entry.name, O_PATH | O_NOFOLLOW);
+    auto item = openBeneathOnMount(entry.parent, entry.name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
+    // Its class is beside its content, which alone is encrypted, or under a lease of its owner's that an open would
+    // wait for: it needs no open.
+    if (!item && (item.error() == ENOKEY || item.error() == EWOULDBLOCK))
+        item = openBeneathOnMount(entry.parent, entry.name, O_PATH | O_NOFOLLOW);
     // Gone, a link, something without a reader, or the place of a mount.
     if (!item && (item.error() == ENOENT || item.error() == ELOOP || item.error() == ENXIO || item.error() == EXDEV))
         return {};

@@ -18,10 +18,12 @@
 #include "fs/TreeWalker.h"
 #include "platform/Disk.h"
 #include "platform/FileProtectionClass.h"
+#include "platform/Mutex.h"
 #include "plist/Value.h"
 
 #include <atomic>
 #include <functional>
+#include <set>
 #include <string>
 #include <string_view>
 #include <unistd.h>
@@ -54,7 +56,9 @@ class ZORFileManager {
 public:
     ZORFileManager(const Log& log, const platform::SystemRoot& root, platform::Disk& disk,
                    platform::FileProtectionClass& protection)
-        : log_(log), disk_(disk), protection_(protection), resolver_(root), daemon_(::geteuid()) {}
+        : log_(log), disk_(disk), protection_(protection),
+          resolver_(root, [this](const FileURL& url, int error) { sayLeft(url.path(), error); }), daemon_(::geteuid()) {
+    }
     ZORFileManager(const ZORFileManager&) = delete;
     ZORFileManager& operator=(const ZORFileManager&) = delete;
 
@@ -116,7 +120,10 @@ public:
     // Existence. An item that cannot be examined, or that an encryption hides, neither exists nor does not exist.
     [[nodiscard]] bool itemExistsAtURL(const FileURL& url);
     [[nodiscard]] bool itemDoesNotExistAtURL(const FileURL& url);
-    /// The same of an item below a directory that is open, for who asks of very many; `url` names it in messages.
+    /// Whether nothing is there, or no directory on the way, and nothing hides it. Silent.
+    [[nodiscard]] bool itemIsGone(const FileURL& url) const;
+    /// Whether nothing is there; of an item below a directory that is open, for who asks of very many; `url` names it
+    /// in messages.
     [[nodiscard]] bool itemDoesNotExistBelow(int directory, const char* relativePath, const FileURL& url);
 
     // Data protection.
@@ -132,6 +139,10 @@ public:
                                   const std::function<bool(const struct stat& status, int current)>& predicate);
 
     [[nodiscard]] const fs::PathResolver& resolver() const { return resolver_; }
+    /// See PathResolver::fence. Before the first use of what lies there.
+    void fence(const FileURL& url, fs::MountFence::Kind kind) { resolver_.fence(url, kind); }
+    /// Says, once for a path, that it was left alone: a mount point (EXDEV), or below a home that does not answer.
+    void sayLeft(const std::string& path, int error);
     [[nodiscard]] platform::Disk& disk() { return disk_; }
     /// Sets a class at the creation of a directory; a file system without classes is said once and is no failure.
     /// 0 or an errno.
@@ -153,10 +164,15 @@ private:
 
     Result<void> setClassOf(int fd, const std::string& path, int protectionClass,
                             const std::function<bool(int)>& predicate);
-    Result<platform::FileDescriptor> openOrCreate(int base, const std::string& relativePath, const FileURL& url,
+    struct Base {
+        int directory;
+        fs::Mounts mounts;
+        bool isUsers = false; ///< a user's own directory
+    };
+    Result<platform::FileDescriptor> openOrCreate(const Base& base, const std::string& relativePath, const FileURL& url,
                                                   Intermediates intermediates, const DirectoryAttributes& attributes);
-    Result<platform::FileDescriptor> makeNewDirectory(int base, std::string_view relativePath, const FileURL& url,
-                                                      Intermediates intermediates,
+    Result<platform::FileDescriptor> makeNewDirectory(const Base& base, std::string_view relativePath,
+                                                      const FileURL& url, Intermediates intermediates,
                                                       const DirectoryAttributes& attributes);
     /// To a directory that this process has just made and that nobody has exchanged.
     Result<void> giveNewDirectory(int directory, const std::string& path, const DirectoryAttributes& attributes);
@@ -181,6 +197,8 @@ private:
     fs::PathResolver resolver_;
     const uid_t daemon_;
     std::atomic<bool> saidClassesUnsupported_{false};
+    platform::Mutex saidMutex_;
+    std::set<std::string> saidLeft_ ZOR_GUARDED_BY(saidMutex_);
 };
 
 } // namespace zor

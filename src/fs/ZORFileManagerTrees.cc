@@ -4,6 +4,7 @@
 #include "fs/BulkDirectoryRead.h"
 #include "fs/DiskUsage.h"
 #include "fs/Hidden.h"
+#include "fs/ItemStatus.h"
 #include "fs/LeftoverNames.h"
 #include "fs/MetadataFileName.h"
 #include "fs/NamesMet.h"
@@ -66,11 +67,12 @@ Result<void> ZORFileManager::removeItemAtURL(const std::optional<FileURL>& url) 
             log_.write(logLevelError, function, "prunetree hit error for %s : %s", ZOR_SHOWN(path),
                        errorText(failure.error));
         struct stat status{};
-        const bool examined =
-            failure.error == EPERM && ::fstatat(failure.parent, failure.name, &status, AT_SYMLINK_NOFOLLOW) == 0;
+        const int unexamined =
+            failure.error == EPERM ? fs::statusOfName(failure.parent, failure.name, status) : failure.error;
+        const bool examined = unexamined == 0;
         if (failure.error == EPERM && !examined)
             log_.write(logLevelError, function, "Failed to stat %s before unsetting UF_IMMUTABLE: %s", ZOR_SHOWN(path),
-                       errorText(errno));
+                       errorText(unexamined));
         if (examined) {
             const int cleared = fs::clearImmutable(disk_, failure.parent, failure.name);
             if (cleared < 0)
@@ -212,19 +214,23 @@ Result<void> ZORFileManager::_traverseDirectory(const FileURL& url,
         return posixError(ZOR_HERE, parent.error(), "fts_open failed for %s with error %s", url.c_str(),
                           errorText(parent.error()));
     std::optional<ZORError> failure;
+    // A directory is walked as itself: whether it may be a mount point, the way to it decides.
+    const auto directory = resolver_.openDirectory(url);
     fs::TreeWalker walker;
-    const int status = walker.walk(parent->directory.get(), parent->name.c_str(), [&](const WalkEntry& entry) {
-        if (entry.kind == WalkEntryKind::noStatus) {
-            failure = posixError({"_traverseDirectory", __LINE__}, entry.error, "Error for path %s: %s", url.c_str(),
-                                 errorText(entry.error));
-            return WalkStep::stop;
-        }
-        if (auto answer = visitor(entry); !answer) {
-            failure = std::move(answer).error();
-            return WalkStep::stop;
-        }
-        return WalkStep::proceed;
-    });
+    const int status = walker.walk(directory ? directory->get() : parent->directory.get(),
+                                   directory ? "." : parent->name.c_str(), [&](const WalkEntry& entry) {
+                                       if (entry.kind == WalkEntryKind::noStatus) {
+                                           failure =
+                                               posixError({"_traverseDirectory", __LINE__}, entry.error,
+                                                          "Error for path %s: %s", url.c_str(), errorText(entry.error));
+                                           return WalkStep::stop;
+                                       }
+                                       if (auto answer = visitor(entry); !answer) {
+                                           failure = std::move(answer).error();
+                                           return WalkStep::stop;
+                                       }
+                                       return WalkStep::proceed;
+                                   });
     if (failure)
         return *failure;
     if (status < 0)
@@ -241,7 +247,7 @@ void ZORFileManager::standardizeEntry(int parent, const char* name, int director
     };
     platform::FileDescriptor opened;
     if (directory < 0) {
-        auto item = platform::openBeneath(parent, name, O_PATH | O_NOFOLLOW);
+        auto item = platform::openBeneathOnMount(parent, name, O_PATH | O_NOFOLLOW);
         if (!item && item.error() != ENOENT)
             notGiven(item.error());
         if (!item)
@@ -295,8 +301,10 @@ Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t
         return posixError(ZOR_HERE, failure, "Could not stat %s: %s", url.c_str(), errorText(failure));
     fs::NamesMet again;              // the root's name has been counted
     standard.others = othersSaidMax; // the root has been said
+    const auto directory = resolver_.openDirectoryPath(url);
     if (!rootIsMetadata)
-        standardizeEntry(parent->directory.get(), parent->name.c_str(), -1, url.path(), standard, again);
+        standardizeEntry(parent->directory.get(), parent->name.c_str(), directory ? directory->get() : -1, url.path(),
+                         standard, again);
     return walked;
 }
 
@@ -323,7 +331,7 @@ Result<std::vector<FileURL>> ZORFileManager::urlsForItemsInDirectoryAtURL(const 
             continue;
         unsigned char type = entry->type;
         struct stat status{};
-        if (type == DT_UNKNOWN && ::fstatat(opened->get(), entry->name, &status, AT_SYMLINK_NOFOLLOW) == 0)
+        if (type == DT_UNKNOWN && fs::statusOfName(opened->get(), entry->name, status) == 0)
             type = static_cast<unsigned char>(IFTODT(status.st_mode));
         urls.push_back(type == DT_DIR ? directory.appendingDirectory(entry->name)
                                       : directory.appendingFile(entry->name));

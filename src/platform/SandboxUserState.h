@@ -21,8 +21,10 @@ public:
     virtual int setMapping(std::uint32_t userId, SandboxItemType type, std::string_view identifier,
                            const std::optional<std::string>& path) = 0;
     /// Removes every mapping whose target is gone, of the users of whom that may be concluded: a home that is not there
-    /// now comes back with its containers. A launch calls it once. How many were removed.
-    virtual unsigned removeDanglingMappings(const std::function<bool(std::uint32_t userId)>& mayConclude) = 0;
+    /// now comes back with its containers. `isGone` is asked of targets inside the system root: it knows where a look
+    /// could wait for a user's file system. A launch calls it once. How many were removed.
+    virtual unsigned removeDanglingMappings(const std::function<bool(std::uint32_t userId)>& mayConclude,
+                                            const std::function<bool(const std::string& path)>& isGone) = 0;
 };
 
 } // namespace zor::platform

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/StorePlaces.h"
 
+#include "fs/ZORFileManager.h"
 #include "store/Names.h"
 
 namespace zor {
@@ -18,6 +19,14 @@ StorePlaces::StorePlaces(const fs::PathResolver& resolver)
       sharedContainersDirectory_(place(resolver, names::sharedContainers)),
       temporaryDirectory_(place(resolver, names::temporary)),
       formerContainersDirectory_(place(resolver, names::formerContainers)) {}
+
+void StorePlaces::fenceMounts(ZORFileManager& fileManager) const {
+    using Kind = fs::MountFence::Kind;
+    fileManager.fence(sharedContainersDirectory_, Kind::systemPlace);
+    fileManager.fence(transientDirectory(), Kind::systemPlace);
+    fileManager.fence(transientBundleDirectory(), Kind::systemPlace);
+    fileManager.fence(formerContainersDirectory_.deletingLastPathComponent(), Kind::home);
+}
 
 FileURL StorePlaces::logDirectory() const {
     return homeDirectory_.appendingDirectory(names::logs);

@@ -14,9 +14,14 @@
 
 namespace zor {
 
+class ZORFileManager;
+
 class StorePlaces {
 public:
     explicit StorePlaces(const fs::PathResolver& resolver);
+
+    /// Sees to it that no mount is crossed where the system's containers lie, whoever works in them.
+    void fenceMounts(ZORFileManager& fileManager) const;
 
     /// The home of the daemon's own directories.
     [[nodiscard]] const FileURL& homeDirectory() const { return homeDirectory_; }

@@ -7,6 +7,8 @@
 #include <climits>
 #include <cstdlib>
 #include <ctime>
+#include <memory>
+#include <string>
 
 namespace zor {
 
@@ -23,28 +25,44 @@ std::int64_t coarseMilliseconds() {
     return std::int64_t{now.tv_sec} * 1000 + now.tv_nsec / 1'000'000;
 }
 
-std::expected<FileURL, int> resolved(const platform::PasswordEntry& entry) {
+std::expected<FileURL, int> resolved(const platform::PasswordEntry& entry, fs::BoundedQuestion& question) {
     // A home may be reached through links that its administrator made; below it, none is followed.
-    char path[PATH_MAX];
-    if (!::realpath(entry.homeDirectory.c_str(), path))
-        return std::unexpected(errno);
-    return FileURL::directory(path);
+    struct Answer {
+        std::string path;
+        int error = 0;
+    };
+    const auto answer = std::make_shared<Answer>();
+    const bool came = question.ask(
+        [answer, home = entry.homeDirectory] {
+            char path[PATH_MAX];
+            if (::realpath(home.c_str(), path))
+                answer->path = path;
+            else
+                answer->error = errno;
+        },
+        fs::homePatience);
+    if (!came || answer->error != 0)
+        return std::unexpected(came ? answer->error : EHOSTDOWN);
+    return FileURL::directory(answer->path);
 }
 
 } // namespace
 
-std::expected<FileURL, int> UserHome::pathOf(const platform::PasswordDatabase& passwords, std::uint32_t userId) {
+std::expected<FileURL, int> UserHome::pathOf(const platform::PasswordDatabase& passwords, std::uint32_t userId,
+                                             fs::BoundedQuestion& question) {
     const auto entry = passwords.entryForUserId(userId);
     if (!entry)
         return std::unexpected(entry.error());
-    return resolved(*entry);
+    return resolved(*entry, question);
 }
 
-UserHome::Found UserHome::find() const {
+UserHome::Found UserHome::find() {
     const auto entry = passwords_.entryForUserId(userId_);
     if (!entry)
         return {.state = entry.error() == ENOENT ? State::noAccount : State::unknown, .directory = {}, .id = {}};
-    const auto path = resolved(*entry);
+    const auto path = resolved(*entry, wayToHome_);
+    if (path)
+        resolver_.fence(*path, fs::MountFence::Kind::home);
     const auto opened = path ? resolver_.openDirectoryPath(*path) : std::unexpected(path.error());
     const auto id = opened ? fs::directoryIdOf(opened->get()) : std::unexpected(opened.error());
     if (!id)

@@ -5,11 +5,13 @@
 // One that does not resolve is none for the moment, and is looked for again at each use. Every change of what was seen
 // gives a new generation, so that who keeps what was read below a home knows whether it still counts.
 //
-// Nothing here makes anything. The disk is asked without a lock; any thread.
+// Nothing here makes anything. The disk is asked without a lock, and not waited for without end; from the first look on
+// no way into the home crosses a mount. Any thread.
 #pragma once
 
 #include "daemon/base/FileURL.h"
 #include "daemon/base/Log.h"
+#include "fs/BoundedQuestion.h"
 #include "fs/PathResolver.h"
 #include "platform/Mutex.h"
 #include "platform/Queries.h"
@@ -51,9 +53,9 @@ public:
     [[nodiscard]] std::uint64_t generation() const { return generation_.load(std::memory_order_acquire); }
 
     /// The home that the password database names, without links; the errno when it names none, or one that is not
-    /// there.
+    /// there; EHOSTDOWN when what the way to it lies on does not answer. `question` is one for each user.
     [[nodiscard]] static std::expected<FileURL, int> pathOf(const platform::PasswordDatabase& passwords,
-                                                            std::uint32_t userId);
+                                                            std::uint32_t userId, fs::BoundedQuestion& question);
 
 private:
     struct Found {
@@ -62,13 +64,14 @@ private:
         fs::DirectoryId id;
         bool operator==(const Found&) const = default;
     };
-    [[nodiscard]] Found find() const;
+    [[nodiscard]] Found find();
     Seen seenOf(const Found& found) const;
 
     const std::uint32_t userId_;
     const Log& log_;
     const fs::PathResolver& resolver_;
     const platform::PasswordDatabase& passwords_;
+    fs::BoundedQuestion wayToHome_;
     std::atomic<std::uint64_t> generation_{0};
     platform::Mutex mutex_;
     Found found_ ZOR_GUARDED_BY(mutex_);

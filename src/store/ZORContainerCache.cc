@@ -168,21 +168,21 @@ Result<void> ZORContainerCache::checkOnDisk(Here here, const Key& key, const Fou
                          "(null)");
     const FileURL file = found.place.url().appendingFile(names::metadataFile);
     // A link or anything else in the file's place is no metadata file: the owner of the container can put it there.
-    const auto item = fileManager_.resolver().openItem(file, O_PATH);
     struct stat status{};
-    if (item && ::fstat(item->get(), &status) == 0 && S_ISREG(status.st_mode)) {
+    const int failure = fileManager_.resolver().status(file, status);
+    if (failure == 0 && S_ISREG(status.st_mode)) {
         traceIdentifier(here, key, foundFormatPrefix, found.record->identifier());
         return {};
     }
-    if (!item && item.error() != ENOENT)
+    if (failure != 0 && failure != ENOENT)
         log_.write(logLevelError, "itemExistsAtURL", "Failed to determine if %s exists: %s", file.c_str(),
-                   errorText(item.error()));
-    if (!item && item.error() == ENOENT && fs::hiddenBy(fileManager_.resolver(), fileManager_.disk(), file))
+                   errorText(failure));
+    if (failure == ENOENT && fs::hiddenBy(fileManager_.resolver(), fileManager_.disk(), file))
         return failedToRebuild(here, key,
                                posixError(here, ENOKEY, "An encryption whose key is away hides %s", file.c_str()));
     std::optional<ZORError> cause;
-    if (!item && isOwnShortage(item.error()))
-        cause = posixError(here, item.error(), "open of %s failed: %s", file.c_str(), errorText(item.error()));
+    if (isOwnShortage(failure))
+        cause = posixError(here, failure, "open of %s failed: %s", file.c_str(), errorText(failure));
     return makeError(log_, here, ErrorCode::cachedContainerWithoutMetadata, cause ? &*cause : nullptr, LogFlag::yes,
                      "Cache: %s%s: INCONSISTENT-No Metadata at: %s", className(key.containerClass),
                      suffix(key.transient), file.c_str());

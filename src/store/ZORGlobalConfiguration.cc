@@ -30,6 +30,7 @@ constexpr DirectoryAttributes bundlesDirectory{.mode = 0755, .otherOwner = bundl
 ZORGlobalConfiguration::ZORGlobalConfiguration(const Log& log, ZORFileManager& fileManager,
                                                const platform::PasswordDatabase& passwords)
     : log_(log), fileManager_(fileManager), places_(fileManager.resolver()) {
+    places_.fenceMounts(fileManager);
     for (std::uint32_t userId = firstMobileUserId; userId <= lastMobileUserId; ++userId)
         homes_.push_back(std::make_unique<UserHome>(userId, log, fileManager.resolver(), passwords));
 }
@@ -59,6 +60,17 @@ ZORPerUserConfiguration* ZORGlobalConfiguration::getPerUserConfigurationForUserI
     if (!made)
         return nullptr;
     return perUserConfigurations_.emplace(userId, std::move(made)).first->second.get();
+}
+
+void ZORGlobalConfiguration::fenceHomes() {
+    for (const auto& home : homes_)
+        (void)home->look();
+}
+
+bool ZORGlobalConfiguration::homeAnswers(std::uint32_t userId) {
+    UserHome* const home = homeOf(userId);
+    const auto directory = home ? home->lookIfDue().directory : std::nullopt;
+    return !directory || fileManager_.resolver().answers(*directory);
 }
 
 FileURL ZORGlobalConfiguration::sharedContainersDirectory() {
@@ -201,12 +213,13 @@ std::optional<FileURL> ZORGlobalConfiguration::containerDirectoryURLForUser(std:
 
 std::optional<UsableDirectory>
 ZORGlobalConfiguration::openClassDirectory(std::uint32_t userId, ContainerClass containerClass, bool transient) {
-    const RecursiveMutexLock held(lock_);
     const bool bundle = isBundleClass(containerClass);
     if (!bundle && !isSystemClass(containerClass)) {
+        // Outside the lock: what makes this user's home wait is nobody else's.
         ZORPerUserConfiguration* user = getPerUserConfigurationForUserId(userId);
         return user ? user->openClassDirectory(containerClass, transient) : std::nullopt;
     }
+    const RecursiveMutexLock held(lock_);
     FileURL base;
     if (!transient)
         base = sharedContainersDirectory();

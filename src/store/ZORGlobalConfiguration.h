@@ -4,7 +4,8 @@
 // A directory getter makes its directory on every call, so one that was moved away is there again at the next; it logs
 // when that fails and returns the place anyway. Whether a user may own a class is its callers' question.
 //
-// One recursive lock is held for a whole getter, directory creation included; it is taken before a per-user one.
+// One recursive lock is held for a whole getter, directory creation included, unless the directory is a mobile user's:
+// then only that user's own.
 #pragma once
 
 #include "daemon/base/ContainerClass.h"
@@ -35,6 +36,12 @@ public:
 
     /// The home of a mobile user, or nullptr outside 501 to 510. No lock; lives as long as this object.
     [[nodiscard]] UserHome* homeOf(std::uint32_t userId) const;
+    /// Knows the homes of all mobile users, so that no way into one crosses a mount. A launch calls it before all else.
+    void fenceHomes();
+    /// False when the file system of a mobile user's home does not answer, after `fs::homePatience` at the latest. Who
+    /// is about to take a lock that others need asks first; for a home on a local disk that costs nothing. True for
+    /// everybody else.
+    [[nodiscard]] bool homeAnswers(std::uint32_t userId);
 
     FileURL sharedContainersDirectory();
     FileURL logDirectory();

@@ -37,6 +37,8 @@ TEST(Error, IsLoggedOnceWhereItIsMade) {
     EXPECT_FALSE(bare.description());
     EXPECT_EQ(static_cast<std::uint64_t>(bare.replyCode()), 0xFFFF'FFFF'FFFF'FFFDU);
     EXPECT_EQ(posixError(ZOR_HERE, EPERM, "x").replyCode(), static_cast<ErrorCode>(EACCES)); // 1 would say success
+    EXPECT_EQ(posixError(ZOR_HERE, EAGAIN, "x").replyCode(), static_cast<ErrorCode>(1000 + EAGAIN)); // 11 is a code
+    EXPECT_EQ(posixError(ZOR_HERE, ENOTEMPTY, "x").replyCode(), static_cast<ErrorCode>(ENOTEMPTY));
     EXPECT_FALSE(cause.is(static_cast<ErrorCode>(2)));
 }
 

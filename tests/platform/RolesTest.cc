@@ -314,7 +314,10 @@ TEST(SandboxUserState, RemovesDanglingMappings) {
     TestRoot test;
     LinkSandboxUserState sandbox(test.root(), test.disk());
     bool mayConclude = false;
-    const auto remove = [&] { return sandbox.removeDanglingMappings([&](std::uint32_t) { return mayConclude; }); };
+    const auto isGone = [](const std::string& path) { return ::access(path.c_str(), F_OK) != 0; };
+    const auto remove = [&] {
+        return sandbox.removeDanglingMappings([&](std::uint32_t) { return mayConclude; }, isGone);
+    };
     EXPECT_EQ(remove(), 0U);
     test.makeDirectories("private/var/mobile/live");
     const auto map = [&](const char* identifier, const std::string& target) {

@@ -9,6 +9,7 @@
 
 #include <algorithm>
 #include <condition_variable>
+#include <csignal>
 #include <fcntl.h>
 #include <filesystem>
 #include <gtest/gtest.h>
@@ -311,7 +312,7 @@ TEST_F(Protection, OnlySoManyWait) {
 }
 
 // Goal: nothing outside a container changes its class, whatever its owner puts in it or swaps while it is walked.
-// Method: links, a FIFO, hard links; then an owner that swaps a directory and a link while changes run.
+// Method: links, a FIFO, hard links, a lease; then an owner that swaps a directory and a link while changes run.
 TEST_F(Protection, HostileOwner) {
     namespace files = std::filesystem;
     const files::path documents = container.path + "/Documents";
@@ -321,6 +322,10 @@ TEST_F(Protection, HostileOwner) {
     files::create_hard_link(outside / "file", documents / "hard");
     ASSERT_EQ(::mkfifo((documents / "fifo").c_str(), 0666), 0);
     put("Documents/one", 3);
+    put("Documents/leased", 3);
+    std::signal(SIGIO, SIG_IGN); // how a holder hears of an open
+    platform::FileDescriptor leased(::open((documents / "leased").c_str(), O_RDWR | O_CLOEXEC));
+    ASSERT_EQ(::fcntl(leased.get(), F_SETLEASE, F_WRLCK), 0);
     files::create_hard_link(documents / "one", container.path + "/Library/two");
     if (::geteuid() == 0) { // else all files are the owner's own
         ASSERT_EQ(::chown((documents / "one").c_str(), mobile, mobile), 0);
@@ -332,6 +337,8 @@ TEST_F(Protection, HostileOwner) {
     }
     EXPECT_EQ(change(to(1)), 1U);
     world.disk().disarm();
+    leased.reset();
+    EXPECT_EQ(classOf(path + "Documents/leased"), 1);
     EXPECT_EQ(classOf("etc/outside/file"), 3);
     EXPECT_EQ(classOf(path + "Documents/one"), 1); // all its names are in the container
     EXPECT_EQ(std::ranges::count_if(world.log.take(),
@@ -383,6 +390,19 @@ private:
     bool works_ = false;
     std::jthread answering_;
 };
+
+// Goal: the daemon's own files can be read while the device is locked. Method: their classes after each kind of write.
+TEST_F(Protection, FilesWithoutProtection) {
+    const std::string metadata = path + names::metadataFile;
+    EXPECT_EQ(classOf(metadata), 4);
+    record(1);
+    EXPECT_EQ(classOf(metadata), 4);
+    const plist::Dictionary entitlements{
+        {std::string(entitlementKeys::applicationGroups), plist::Array{plist::Value("group")}}};
+    ASSERT_EQ(world.services().entitlements().processEntitlements(&entitlements, &identifier, nullptr),
+              ErrorCode::success);
+    EXPECT_EQ(classOf("private/var/root/Library/Zorvane/zor_entitlements.plist"), 4);
+}
 
 // Goal: a forbidden open is the change's error; taken for a lock it would be tried again for ever. Method: a listener
 // that refuses the opens of the container, then of a file in it.

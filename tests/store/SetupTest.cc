@@ -260,6 +260,7 @@ TEST(SandboxMapping, RemovesThenSets) {
                                             "Failed to set " + mapping + " " + tail + url.path() + " : 28"}));
     }
     // A stop between the move of a container and its mapping leaves one that points to nothing; the launch removes it.
+    std::filesystem::create_directory(world.path("private/var/mobile/Containers")); // the home is there, and shown
     ASSERT_TRUE(map(application, world.url("private/var/mobile/gone")));
     ASSERT_TRUE(map(ContainerClass::sharedAppGroup, url));
     world.daemonsClient().containerManagerSetup();

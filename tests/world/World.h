@@ -94,8 +94,9 @@ public:
         const int failure = path ? setError : removeError;
         return failure != 0 ? failure : inner->setMapping(userId, type, identifier, path);
     }
-    unsigned removeDanglingMappings(const std::function<bool(std::uint32_t)>& mayConclude) override {
-        return inner->removeDanglingMappings(mayConclude);
+    unsigned removeDanglingMappings(const std::function<bool(std::uint32_t)>& mayConclude,
+                                    const std::function<bool(const std::string&)>& isGone) override {
+        return inner->removeDanglingMappings(mayConclude, isGone);
     }
     platform::SandboxUserState* inner = nullptr;
     int setError = 0;

@@ -62,7 +62,7 @@ std::map<std::string, std::string> classesOnDisk(const std::string& path) {
     while (const dirent* entry = ::readdir(entries.get())) {
         if (entry->d_name[0] == '.')
             continue;
-        if (const auto item = openBeneath(fd, entry->d_name, O_RDONLY | O_DIRECTORY))
+        if (const auto item = zor::platform::openBeneathOnMount(fd, entry->d_name, O_RDONLY | O_DIRECTORY))
             classes.emplace(entry->d_name, classOnDisk(item->get()));
     }
     return classes;

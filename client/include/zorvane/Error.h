@@ -23,7 +23,8 @@ struct Error {
         daemon,
     };
     Kind kind = Kind::protocol;
-    /// The daemon's code; 0 unless kind is daemon.
+    /// The daemon's code; 0 unless kind is daemon. Where a step failed that has no code of its own, the system's errno:
+    /// as it is where no code of the daemon's has that number, else with 1000 added.
     std::uint64_t code = 0;
     /// One sentence for people, without a full stop.
     std::string message;

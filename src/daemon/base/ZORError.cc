@@ -16,9 +16,67 @@ bool ZORError::isOwnShortage() const {
            (underlying_ && underlying_->isOwnShortage());
 }
 
+namespace {
+
+/// Where the numbers of errno that read as codes of the system go; clients know the offset (client/ErrorText.cc).
+constexpr int errnoOffset = 1000;
+
+bool isSystemCode(int number) {
+    using enum ErrorCode;
+    switch (static_cast<ErrorCode>(number)) {
+    case success:
+    case moveToTemporaryFailed:
+    case transientRemovalFailed:
+    case subdirectoryFailed:
+    case stagingDirectoryFailed:
+    case moveToLiveFailed:
+    case stagingRemovalFailed:
+    case pathNotAsExpected:
+    case invalidObject:
+    case metadataUnreadable:
+    case oldNotMovedToStaging:
+    case newNotMovedIntoPlace:
+    case deathRowItemNotDestroyed:
+    case identifierMissing:
+    case notFound:
+    case replacedByItself:
+    case classesDiffer:
+    case infoKeyNotFound:
+    case alreadyExists:
+    case listForDeletionFailed:
+    case metadataInvalid:
+    case journalValuesInvalid:
+    case propertyListNotWritten:
+    case journalUnusable:
+    case replaceCleanUpFailed:
+    case valueNotAllowed:
+    case exceptionCaught:
+    case moveToDeathRowFailed:
+    case cacheNotRebuilt:
+    case cachedContainerWithoutMetadata:
+    case cacheAddFailed:
+    case cacheRemoveFailed:
+    case cacheInputInvalid:
+    case directoryNotRenamed:
+    case notEntitled:
+    case usersDiffer:
+    case entitlementFileNotWritten:
+    case entitlementCountsDiffer:
+    case lockedAndNotRetried:
+    case ownerNotChanged:
+        return true;
+    }
+    return false;
+}
+
+} // namespace
+
 ErrorCode ZORError::replyCode() const {
+    int number = isPosix(EPERM) ? EACCES : code_;
+    if (domain_ == ErrorDomain::posix && isSystemCode(number))
+        number += errnoOffset;
     // A POSIX number is none of the enumerators: it is carried, not converted.
-    return std::bit_cast<ErrorCode>(static_cast<std::int64_t>(isPosix(EPERM) ? EACCES : code_));
+    return std::bit_cast<ErrorCode>(static_cast<std::int64_t>(number));
 }
 
 void logError(const Log& log, const ZORError& error) {

@@ -40,6 +40,11 @@ namespace zor::commands {
                                                                 ContainerClass containerClass) {
     const auto resolved = context.users.validateUserId(static_cast<std::uint32_t>(requested), containerClass,
                                                        context.client->clientUserId());
+    if (resolved && isPerUserClass(containerClass) && !context.services.configuration.homeAnswers(*resolved)) {
+        // Before the request takes any lock. What would stop it there would stop everybody.
+        context.error = ErrorCode::cacheNotRebuilt;
+        return std::nullopt;
+    }
     if (resolved)
         return *resolved;
     context.error = resolved.error().replyCode();

@@ -75,7 +75,8 @@ int LinkSandboxUserState::setMapping(std::uint32_t userId, SandboxItemType type,
     return -renamed;
 }
 
-unsigned LinkSandboxUserState::removeDanglingMappings(const std::function<bool(std::uint32_t userId)>& mayConclude) {
+unsigned LinkSandboxUserState::removeDanglingMappings(const std::function<bool(std::uint32_t userId)>& mayConclude,
+                                                      const std::function<bool(const std::string& path)>& isGone) {
     unsigned removed = 0;
     forEachSandboxDirectory(root_, [&](const SandboxDirectory& directory) {
         const auto userId = directory.userId();
@@ -83,7 +84,7 @@ unsigned LinkSandboxUserState::removeDanglingMappings(const std::function<bool(s
         for (const std::string& name : directoryNamesIfAny(directory.descriptor)) {
             if (isSandboxLeftover(name))
                 (void)disk_.unlinkFile(directory.descriptor, name.c_str());
-            else if (concludes && isDanglingSandboxLink(root_, disk_, directory.descriptor, name.c_str()) &&
+            else if (concludes && isDanglingSandboxLink(root_, directory.descriptor, name.c_str(), isGone) &&
                      disk_.unlinkFile(directory.descriptor, name.c_str()) == 0)
                 ++removed;
         }

@@ -22,7 +22,8 @@ public:
     /// ENAMETOOLONG when the encoded identifier is no file name any more, EINVAL when it is empty.
     int setMapping(std::uint32_t userId, SandboxItemType type, std::string_view identifier,
                    const std::optional<std::string>& path) override;
-    unsigned removeDanglingMappings(const std::function<bool(std::uint32_t userId)>& mayConclude) override;
+    unsigned removeDanglingMappings(const std::function<bool(std::uint32_t userId)>& mayConclude,
+                                    const std::function<bool(const std::string& path)>& isGone) override;
 
 private:
     enum class Missing { fail, make };

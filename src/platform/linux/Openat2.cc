@@ -49,6 +49,16 @@ std::expected<FileDescriptor, int> openBeneathOnMount(int directory, const char*
     return resolve(directory, relativePath, flags, 0, RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS | RESOLVE_NO_XDEV);
 }
 
+std::expected<FileDescriptor, int> openBeneathRemembered(int directory, const char* relativePath, int flags) {
+    open_how how{};
+    how.flags = static_cast<std::uint64_t>(static_cast<unsigned>(flags | O_PATH | O_CLOEXEC));
+    how.resolve = RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS | RESOLVE_CACHED;
+    const long fd = ::syscall(SYS_openat2, directory, relativePath, &how, sizeof how);
+    if (fd >= 0)
+        return FileDescriptor(static_cast<int>(fd));
+    return std::unexpected(errno == EINVAL ? EAGAIN : errno);
+}
+
 std::expected<FileDescriptor, int> openInRoot(int directory, const char* relativePath, int flags) {
     return resolve(directory, relativePath, flags, 0, RESOLVE_IN_ROOT | RESOLVE_NO_MAGICLINKS);
 }

@@ -19,6 +19,11 @@ namespace zor::platform {
 /// asked. A ".." is refused even where it stays inside.
 [[nodiscard]] std::expected<FileDescriptor, int> openBeneathOnMount(int directory, const char* relativePath, int flags);
 
+/// The same as openBeneath with O_PATH, out of the kernel's memory of names alone: no file system is asked, so none can
+/// make it wait. EAGAIN, as often as it likes, where one would have to be asked, or where the kernel has no such call.
+[[nodiscard]] std::expected<FileDescriptor, int> openBeneathRemembered(int directory, const char* relativePath,
+                                                                       int flags);
+
 /// The same as openBeneath for trees that only root writes to, such as DIR/etc: links are followed, as if `directory`
 /// were "/".
 [[nodiscard]] std::expected<FileDescriptor, int> openInRoot(int directory, const char* relativePath, int flags);

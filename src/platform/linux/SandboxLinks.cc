@@ -35,24 +35,8 @@ std::optional<std::uint32_t> SandboxDirectory::userId() const {
     return error == std::errc() && last == end ? std::optional(number) : std::nullopt;
 }
 
-namespace {
-
-/// Whether the nearest directory that is there, above what is not, hides what is in it.
-bool isHidden(const SystemRoot& root, Disk& disk, std::string path) {
-    for (;;) {
-        const auto opened = openInRoot(root.descriptor(), path.c_str(), O_PATH | O_DIRECTORY);
-        if (opened || path == "/")
-            return opened && disk.hidesNames(opened->get());
-        const auto slash = path.rfind('/');
-        path.resize(slash == 0 || slash == path.npos ? 0 : slash);
-        if (path.empty())
-            path = "/";
-    }
-}
-
-} // namespace
-
-bool isDanglingSandboxLink(const SystemRoot& root, Disk& disk, int directory, const char* name) {
+bool isDanglingSandboxLink(const SystemRoot& root, int directory, const char* name,
+                           const std::function<bool(const std::string& path)>& isGone) {
     char buffer[PATH_MAX];
     const ssize_t bytes = ::readlinkat(directory, name, buffer, sizeof buffer);
     if (bytes < 0 || bytes == sizeof buffer)
@@ -66,8 +50,7 @@ bool isDanglingSandboxLink(const SystemRoot& root, Disk& disk, int directory, co
     }
     if (!below.starts_with('/'))
         return true;
-    const auto found = openInRoot(root.descriptor(), std::string(below).c_str(), O_PATH | O_NOFOLLOW);
-    return !found && (found.error() == ENOENT || found.error() == ENOTDIR) && !isHidden(root, disk, std::string(below));
+    return isGone(std::string(buffer, static_cast<std::size_t>(bytes)));
 }
 
 } // namespace zor::platform

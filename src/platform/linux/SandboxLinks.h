@@ -28,8 +28,8 @@ void forEachSandboxDirectory(const SystemRoot& root, const std::function<void(co
 [[nodiscard]] inline bool isSandboxLeftover(const std::string& name) {
     return name.starts_with('.');
 }
-/// Whether the link leads to nothing, or out of the root. False when that cannot be known, as where an encryption hides
-/// what it leads to.
-[[nodiscard]] bool isDanglingSandboxLink(const SystemRoot& root, Disk& disk, int directory, const char* name);
+/// Whether the link leads to nothing, as `isGone` says of a path inside the root, or out of the root.
+[[nodiscard]] bool isDanglingSandboxLink(const SystemRoot& root, int directory, const char* name,
+                                         const std::function<bool(const std::string& path)>& isGone);
 
 } // namespace zor::platform

@@ -6,6 +6,7 @@
 
 #include <cerrno>
 #include <charconv>
+#include <cstdio>
 #include <string>
 #include <sys/mman.h>
 #include <sys/xattr.h>

@@ -2,6 +2,7 @@
 #include "store/operations/ContainerBuilder.h"
 
 #include "fs/AtomicFile.h"
+#include "fs/DictionaryFile.h"
 #include "fs/OwnedFile.h"
 #include "platform/linux/Openat2.h"
 #include "plist/Binary.h"
@@ -85,8 +86,10 @@ Result<void> ContainerBuilder::writeMetadata(const ZORMetadata& record) {
         status = fs::writeNewFile(disk_, directory_.get(), names::metadataFile, metadataMode, *bytes);
     if (status >= 0) {
         metadata_ = FileDescriptor(status);
-        return {};
+        status = -fileManager_.setClassAtCreation(metadata_.get(), classWithoutProtection);
     }
+    if (status >= 0)
+        return {};
     const ZORError cause = posixError(ZOR_HERE, -status, "write of %s failed: %s", names::metadataFile,
                                       bytes ? errorText(-status) : bytes.error().reason);
     return makeError(log_, ZOR_HERE, ErrorCode::propertyListNotWritten, &cause, LogFlag::yes,

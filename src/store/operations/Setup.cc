@@ -51,6 +51,7 @@ bool isUserClass(ContainerClass containerClass) {
 
 void ZORClientConnection::rebootContainerManagerSetup() {
     SetupReport& report = services_.setup;
+    services_.configuration.fenceHomes();
     report.run("bundle migration", [this] { return migrateBundles(); });
     report.run("well-known migration", [this] { return migrateWellknown(); });
     report.run("shared transient containers", [this] {
@@ -244,6 +245,7 @@ void ZORClientConnection::makeDirectoriesDurable() {
 
 void ZORClientConnection::containerManagerSetup() {
     SetupReport& report = services_.setup;
+    services_.configuration.fenceHomes();
     report.run("replace recovery", [this] {
         const std::size_t journals = journalCount();
         if (!_recoverFromReplaceOperationsWithError())
@@ -254,8 +256,9 @@ void ZORClientConnection::containerManagerSetup() {
     deleteContainersOnDeathRowWithCompletion(nullptr);
     // A stop between the move of a container and its mapping leaves a mapping that points to nothing.
     report.run("dangling mappings", [this] {
-        const unsigned removed =
-            services_.sandbox.removeDanglingMappings([this](std::uint32_t userId) { return showsContainers(userId); });
+        const unsigned removed = services_.sandbox.removeDanglingMappings(
+            [this](std::uint32_t userId) { return showsContainers(userId); },
+            [this](const std::string& path) { return services_.fileManager.itemIsGone(FileURL::directory(path)); });
         if (removed != 0)
             services_.log.write(logLevelNotice, launchFunction, "Removed %u sandbox mappings whose container is gone",
                                 removed);

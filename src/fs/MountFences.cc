@@ -1,0 +1,235 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "fs/MountFences.h"
+
+#include "platform/linux/Openat2.h"
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <fcntl.h>
+#include <unistd.h>
+#include <utility>
+
+namespace zor::fs {
+
+using platform::FileDescriptor;
+using platform::MutexLock;
+using platform::openBeneath;
+using platform::openBeneathOnMount;
+
+namespace {
+
+constexpr int pathFlags = O_PATH | O_DIRECTORY | O_NOFOLLOW;
+/// Of a class below the place of its containers, such as "Data/System".
+constexpr std::size_t classLevels = 2;
+
+/// File systems that nobody but the kernel serves, from what lies in this machine.
+constexpr std::array<std::string_view, 16> localTypes = {"bcachefs", "btrfs", "ecryptfs", "erofs", "exfat", "ext2",
+                                                         "ext3",     "ext4",  "f2fs",     "jfs",   "ntfs3", "overlay",
+                                                         "ramfs",    "tmpfs", "vfat",     "xfs"};
+
+struct FileCloser {
+    void operator()(std::FILE* file) const { std::fclose(file); }
+};
+struct Freed {
+    void operator()(char* memory) const { std::free(memory); }
+};
+
+/// Of the type and the options behind the " - " of a line.
+MountKind kindOf(std::string_view type, std::string_view options) {
+    if (std::ranges::find(localTypes, type) != localTypes.end())
+        return MountKind::local;
+    constexpr std::string_view server = "user_id=";
+    const std::size_t at = options.find(server);
+    if (!type.starts_with("fuse") || at == options.npos)
+        return MountKind::mayHang;
+    const auto user = std::strtoul(options.data() + at + server.size(), nullptr, 10);
+    return user == 0 || user == ::geteuid() ? MountKind::mayHang : MountKind::usersOwn;
+}
+
+const char* behindSlashes(const char* text) {
+    while (*text == '/')
+        ++text;
+    return text;
+}
+
+} // namespace
+
+MountKind kindOfMount(std::uint64_t number) {
+    const std::unique_ptr<std::FILE, FileCloser> mounts(std::fopen("/proc/self/mountinfo", "re"));
+    char* line = nullptr;
+    std::size_t lineBytes = 0;
+    MountKind kind = MountKind::mayHang; // also one that is not to be seen from here
+    while (mounts && ::getline(&line, &lineBytes, mounts.get()) > 0) {
+        if (std::strtoull(line, nullptr, 10) != number)
+            continue;
+        const char* const separator = std::strstr(line, " - ");
+        if (!separator)
+            continue;
+        const std::string_view rest(separator + 3);
+        kind = kindOf(rest.substr(0, rest.find(' ')), rest);
+        break;
+    }
+    const std::unique_ptr<char, Freed> memory(line);
+    return kind;
+}
+
+MountFence::MountFence(int root, std::string_view path, Kind kind)
+    : kind_(kind), judgement_(std::make_shared<Judgement>()) {
+    judgement_->path = path;
+    judgement_->root = root;
+}
+
+bool MountFence::holds(std::string_view path) const {
+    const std::string& own = judgement_->path;
+    return path.starts_with(own) && (path.size() == own.size() || path[own.size()] == '/');
+}
+
+std::size_t MountFence::ownBytes(std::string_view path) const {
+    std::size_t end = judgement_->path.size();
+    for (std::size_t level = 0; kind_ == Kind::systemPlace && level < classLevels && end < path.size(); ++level)
+        end = std::min(path.find('/', end + 1), path.size());
+    return end;
+}
+
+MountKind MountFence::Judgement::judge(int home) {
+    struct stat status{};
+    MountIdentity found;
+    if (statusOfDescriptor(home, status, found) != 0)
+        return MountKind::mayHang;
+    {
+        const MutexLock held(mutex);
+        if (kind != MountKind::unknown && mount == found)
+            return kind;
+    }
+    const MountKind judged = kindOfMount(mountNumber(home));
+    const MutexLock held(mutex);
+    mount = found;
+    kind = judged;
+    answeredAt = {}; // another one did
+    return judged;
+}
+
+void MountFence::Judgement::ask() {
+    const auto home = openBeneath(ownRoot.get(), path.c_str(), pathFlags);
+    struct statx answer{};
+    if (home && judge(home->get()) == MountKind::mayHang)
+        (void)::statx(home->get(), "", AT_EMPTY_PATH | AT_STATX_FORCE_SYNC, STATX_BASIC_STATS, &answer);
+    const MutexLock held(mutex);
+    answeredAt = std::chrono::steady_clock::now();
+}
+
+bool MountFence::answers() {
+    if (kind_ != Kind::home)
+        return true;
+    {
+        const MutexLock held(judgement_->mutex);
+        if (judgement_->kind == MountKind::local || judgement_->kind == MountKind::usersOwn ||
+            std::chrono::steady_clock::now() - judgement_->answeredAt < homeAnswerHolds)
+            return true;
+        // The question may outlive this object, and whoever made it.
+        if (!judgement_->ownRoot.valid())
+            judgement_->ownRoot.reset(::fcntl(judgement_->root, F_DUPFD_CLOEXEC, 0));
+    }
+    return question_.ask([judgement = judgement_] { judgement->ask(); }, homePatience);
+}
+
+OpenResult MountFence::openOwn(const char* path, std::size_t ownBytes) {
+    if (!answers())
+        return std::unexpected(EHOSTDOWN);
+    auto opened = openBeneath(judgement_->root, std::string(path, ownBytes).c_str(), pathFlags);
+    if (!opened || kind_ != Kind::home)
+        return opened;
+    const MountKind kind = judgement_->judge(opened->get());
+    if (kind == MountKind::usersOwn)
+        return std::unexpected(EXDEV);
+    // It may have been mounted a moment ago, over one that needed no question.
+    if (kind == MountKind::mayHang && !answers())
+        return std::unexpected(EHOSTDOWN);
+    return opened;
+}
+
+OpenResult MountFence::open(const char* path, int flags) {
+    const std::size_t own = ownBytes(path);
+    const char* const rest = behindSlashes(path + own);
+    if (*rest == '\0' && kind_ == Kind::systemPlace)
+        return openBeneath(judgement_->root, path, flags);
+    auto fence = openOwn(path, own);
+    if (!fence || (*rest == '\0' && (flags & O_PATH) != 0))
+        return fence;
+    return openBeneathOnMount(fence->get(), *rest == '\0' ? "." : rest, flags);
+}
+
+int MountFence::rememberedStatus(const char* path, struct stat& status) {
+    {
+        const MutexLock held(judgement_->mutex);
+        if (judgement_->kind != MountKind::local)
+            return EAGAIN;
+    }
+    const auto item = platform::openBeneathRemembered(judgement_->root, path, O_NOFOLLOW);
+    MountIdentity mount;
+    if (!item || statusOfDescriptor(item->get(), status, mount) != 0)
+        return EAGAIN;
+    const MutexLock held(judgement_->mutex);
+    return judgement_->kind == MountKind::local && judgement_->mount == mount ? 0 : EAGAIN;
+}
+
+int MountFence::status(const char* path, struct stat& status) {
+    // What is remembered, and lies on the mount that was judged, is found without a question to any file system.
+    if (rememberedStatus(path, status) == 0)
+        return 0;
+    const std::size_t own = ownBytes(path);
+    const bool isOwn = *behindSlashes(path + own) == '\0';
+    if (isOwn && kind_ == Kind::home) {
+        const auto fence = openOwn(path, own);
+        MountIdentity mount;
+        return fence ? statusOfDescriptor(fence->get(), status, mount) : fence.error();
+    }
+    const std::string whole(path);
+    const std::size_t slash = whole.rfind('/');
+    const std::string name = whole.substr(slash + 1);
+    const std::string parent = slash == whole.npos ? "." : whole.substr(0, slash);
+    const auto directory =
+        isOwn ? openBeneath(judgement_->root, parent.c_str(), pathFlags) : open(parent.c_str(), pathFlags);
+    if (!directory)
+        return directory.error();
+    const int error = statusOfName(directory->get(), name.c_str(), status);
+    if (isOwn)
+        return error == EXDEV ? 0 : error;
+    if (kind_ == Kind::systemPlace) {
+        struct stat ignored{};
+        MountIdentity mount;
+        if (statusOfDescriptor(directory->get(), ignored, mount) == 0) {
+            const MutexLock held(judgement_->mutex);
+            judgement_->mount = mount;
+            judgement_->kind = MountKind::local;
+        }
+    }
+    return error;
+}
+
+MountFences::~MountFences() {
+    for (const Link* link = first_; link;)
+        delete std::exchange(link, link->next);
+}
+
+void MountFences::add(std::string_view path, MountFence::Kind kind) {
+    const MutexLock held(adding_);
+    for (const Link* link = first_; link; link = link->next)
+        if (link->fence.isHome() == (kind == MountFence::Kind::home) && link->fence.path() == path)
+            return;
+    first_ = new Link{.fence = {root_, path, kind}, .next = first_};
+}
+
+MountFence* MountFences::around(std::string_view path) const {
+    MountFence* outermost = nullptr;
+    for (Link* link = first_; link; link = link->next)
+        if (link->fence.holds(path) && (!outermost || link->fence.path().size() < outermost->path().size()))
+            outermost = &link->fence;
+    return outermost;
+}
+
+} // namespace zor::fs

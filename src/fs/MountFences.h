@@ -1,0 +1,118 @@
+// SPDX-License-Identifier: Apache-2.0
+// Below which directories users can mount, and how what lies below one is reached without waiting for what they
+// mounted.
+//
+// A fence is a directory: a user's home, or the place of containers that belong to the system. Below it no step of a
+// path crosses a mount, so the file system of a mount point there is never asked. The fence itself may lie on any
+// mount. That of a home is judged whenever it is another than before: a file system that a user serves (FUSE) is no
+// home, EXDEV; one that is not of this machine may stop answering. Such a home is asked on a thread of its own whether
+// it still answers, at most once in `answerHoldsMilliseconds`, and while it does not, all that leads there fails
+// with EHOSTDOWN at once. What is not defended: a home that stops answering within that time holds the thread that is
+// there.
+//
+// Changes nothing on the disk. Any thread; fences are added, never taken away.
+#pragma once
+
+#include "fs/BoundedQuestion.h"
+#include "fs/ItemStatus.h"
+#include "platform/FileDescriptor.h"
+#include "platform/Mutex.h"
+
+#include <atomic>
+#include <chrono>
+#include <cstdint>
+#include <expected>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <sys/stat.h>
+
+namespace zor::fs {
+
+using OpenResult = std::expected<platform::FileDescriptor, int>;
+
+/// How long a home that may stop answering is believed to answer; its requests pay one question in that time.
+inline constexpr std::chrono::milliseconds homeAnswerHolds{1000};
+/// How long a home is waited for. A file system over a network that takes longer stops its user's requests only.
+inline constexpr std::chrono::milliseconds homePatience{2000};
+
+/// Of a home's mount.
+enum class MountKind {
+    unknown,
+    local,    ///< a disk, or memory, of this machine
+    mayHang,  ///< somebody else serves it
+    usersOwn, ///< a user of this machine serves it
+};
+/// What /proc/self/mountinfo says of the mount with that number.
+[[nodiscard]] MountKind kindOfMount(std::uint64_t number);
+
+class MountFence {
+public:
+    enum class Kind { home, systemPlace };
+    /// Below `path`, which is relative to the directory that is open as `root`.
+    MountFence(int root, std::string_view path, Kind kind);
+    MountFence(const MountFence&) = delete;
+    MountFence& operator=(const MountFence&) = delete;
+
+    [[nodiscard]] bool isHome() const { return kind_ == Kind::home; }
+    [[nodiscard]] std::string_view path() const { return judgement_->path; }
+    /// Whether the relative path is the fence's directory, or lies below it.
+    [[nodiscard]] bool holds(std::string_view path) const;
+    /// How much of such a path may lie on any mount: of system places, up to the class directory.
+    [[nodiscard]] std::size_t ownBytes(std::string_view path) const;
+
+    /// Whether the home answers; false after `homePatience` at the latest. Costs nothing for a home on a local disk.
+    [[nodiscard]] bool answers();
+    /// Opens what lies at a path that the fence holds. EXDEV where that is, or lies behind, a mount point; EHOSTDOWN.
+    [[nodiscard]] OpenResult open(const char* path, int flags);
+    /// lstat: 0 or an errno, as above.
+    [[nodiscard]] int status(const char* path, struct stat& status);
+
+private:
+    /// Shared with a question that may not come back.
+    struct Judgement {
+        int root = -1;
+        platform::FileDescriptor ownRoot;
+        std::string path;
+        platform::Mutex mutex;
+        MountIdentity mount ZOR_GUARDED_BY(mutex);
+        MountKind kind ZOR_GUARDED_BY(mutex) = MountKind::unknown;
+        std::chrono::steady_clock::time_point answeredAt ZOR_GUARDED_BY(mutex);
+
+        /// Judges the mount of the home that is open, unless it is the one that was judged last.
+        MountKind judge(int home) ZOR_EXCLUDES(mutex);
+        void ask() ZOR_EXCLUDES(mutex);
+    };
+    [[nodiscard]] OpenResult openOwn(const char* path, std::size_t ownBytes);
+    [[nodiscard]] int rememberedStatus(const char* path, struct stat& status);
+
+    const Kind kind_;
+    const std::shared_ptr<Judgement> judgement_;
+    BoundedQuestion question_;
+};
+
+class MountFences {
+public:
+    explicit MountFences(int root) : root_(root) {}
+    ~MountFences();
+    MountFences(const MountFences&) = delete;
+    MountFences& operator=(const MountFences&) = delete;
+
+    /// Adds a fence, unless there is that one already.
+    void add(std::string_view path, MountFence::Kind kind);
+    /// The outermost fence that holds the relative path; nullptr when none does.
+    [[nodiscard]] MountFence* around(std::string_view path) const;
+
+private:
+    struct Link {
+        MountFence fence;
+        Link* next;
+    };
+    const int root_;
+    platform::Mutex adding_;
+    /// Read without a lock: links are put before the first, and stay.
+    std::atomic<Link*> first_{nullptr};
+};
+
+} // namespace zor::fs

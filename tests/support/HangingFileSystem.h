@@ -1,0 +1,30 @@
+// SPDX-License-Identifier: Apache-2.0
+// A file system (FUSE) that its server never answers for, as any user may mount one where fusermount lets him.
+#pragma once
+
+#include "platform/FileDescriptor.h"
+
+#include <string>
+#include <sys/types.h>
+
+namespace zor::support {
+
+class HangingFileSystem {
+public:
+    /// On a directory or a file. `server` is the user who is said to serve it.
+    HangingFileSystem(std::string at, uid_t server);
+    /// Who waits for it then gets an error.
+    ~HangingFileSystem();
+    HangingFileSystem(const HangingFileSystem&) = delete;
+    HangingFileSystem& operator=(const HangingFileSystem&) = delete;
+
+    /// False where such mounts are not permitted.
+    [[nodiscard]] bool mounted() const { return mounted_; }
+
+private:
+    const std::string at_;
+    platform::FileDescriptor device_;
+    bool mounted_ = false;
+};
+
+} // namespace zor::support

@@ -1,0 +1,116 @@
+// SPDX-License-Identifier: Apache-2.0
+// File systems that users mount in what is theirs, and that never answer.
+#include "process/DaemonProcess.h"
+#include "support/HangingFileSystem.h"
+
+#include <atomic>
+#include <chrono>
+#include <gtest/gtest.h>
+#include <thread>
+
+namespace zor::whole {
+
+namespace {
+
+constexpr uid_t second = 502;
+constexpr double patienceSeconds = 8;
+
+double secondsOf(const std::function<void()>& work) {
+    const auto begin = std::chrono::steady_clock::now();
+    work();
+    return std::chrono::duration<double>(std::chrono::steady_clock::now() - begin).count();
+}
+
+/// Whether the daemon answers `ask` at all, be it with an error of its own.
+template <typename Ask>
+bool isAnswered(const DaemonProcess& daemon, Ask ask) {
+    auto client = zorvane::Client::connect({.root = daemon.root(), .timeoutMilliseconds = 8'000});
+    if (!client)
+        return false;
+    const auto answer = ask(*client);
+    return answer || answer.error().kind == zorvane::Error::Kind::daemon;
+}
+
+bool serves(const DaemonProcess& daemon, uid_t user) {
+    auto client = zorvane::Client::connect({.root = daemon.root(), .timeoutMilliseconds = 8'000});
+    auto lookup = dataContainer("app");
+    lookup.user = user;
+    return client && client->createOrLookup(lookup);
+}
+
+/// Each kind of request about the container, all answered.
+void expectAnswers(const DaemonProcess& daemon, const zorvane::Client::Address& app) {
+    EXPECT_TRUE(isAnswered(daemon, [&](auto& client) { return client.createOrLookup(dataContainer("app")); }));
+    EXPECT_TRUE(isAnswered(daemon, [&](auto& client) { return client.createOrLookup(dataContainer("new")); }));
+    EXPECT_TRUE(isAnswered(daemon, [&](auto& client) { return client.createOrLookup(dataContainer("t", true)); }));
+    EXPECT_TRUE(isAnswered(daemon, [](auto& client) { return client.list(dataApplication, mobile, false); }));
+    EXPECT_TRUE(isAnswered(daemon, [&](auto& client) { return client.diskUsage(app); }));
+    EXPECT_TRUE(isAnswered(daemon, [&](auto& client) { return client.recreateDefaultStructure(app); }));
+    EXPECT_TRUE(isAnswered(daemon, [&](auto& client) { return client.setInfoValue(app, "k", zorvane::Value{true}); }));
+    EXPECT_TRUE(isAnswered(daemon, [](auto& client) {
+        return client.setDataProtection(
+            {.containerClass = dataApplication, .user = mobile, .identifier = "app", .protectionClass = 1});
+    }));
+    EXPECT_TRUE(isAnswered(daemon, [](auto& client) { return client.processEntitlements({.identifier = "app"}); }));
+    EXPECT_TRUE(isAnswered(daemon, [](auto& client) { return client.wipe(dataApplication, mobile, "app"); }));
+    EXPECT_TRUE(isAnswered(daemon, [&](auto& client) { return client.stageForDelete({app}); }));
+    EXPECT_TRUE(isAnswered(daemon, [](auto& client) { return client.emptyDeathRow(); }));
+}
+
+} // namespace
+
+// Goal: a file system that never answers, wherever a user can mount it, or a home that is served over a network, keeps
+// nobody else, no end and no start waiting. Method: mounts on a real daemon's root whose server is silent.
+TEST(UserMount, KeepsNobodyWaiting) {
+    struct Row {
+        const char* below; // of the home; "@" is the container
+        uid_t server;
+    };
+    const Row rows[] = {{"", mobile},
+                        {"", 0},
+                        {"Containers", mobile},
+                        {"Containers/Data/Application", mobile},
+                        {"@", mobile},
+                        {"@/Documents", mobile},
+                        {"@/Documents/file", mobile},
+                        {"@/.com.veltra.zorvane.metadata.plist", mobile}};
+    for (const Row& row : rows) {
+        SCOPED_TRACE(std::string(row.below) + " served by " + std::to_string(row.server));
+        DaemonProcess daemon;
+        daemon.start();
+        const auto made = daemon.client().createOrLookup(dataContainer("app")).value();
+        ASSERT_TRUE(serves(daemon, second));
+        writeFile(made.path + "/Documents/file", "x");
+        const std::string below = row.below;
+        const std::string place = below.starts_with('@')
+                                      ? made.path + below.substr(1)
+                                      : daemon.path("private/var/mobile") + (below.empty() ? "" : "/") + below;
+        std::optional<support::HangingFileSystem> hanging(std::in_place, place, row.server);
+        if (!hanging->mounted())
+            GTEST_SKIP() << "file systems of users (FUSE) cannot be mounted here";
+        std::atomic<bool> ended = false;
+        std::thread lookups([&] {
+            while (!ended) {
+                EXPECT_LT(secondsOf([&] { EXPECT_TRUE(serves(daemon, second)); }), patienceSeconds);
+                std::this_thread::sleep_for(std::chrono::milliseconds(20));
+            }
+        });
+        expectAnswers(daemon,
+                      {.containerClass = dataApplication, .user = mobile, .identifier = "app", .uuid = made.uuid});
+        ended = true;
+        lookups.join();
+        EXPECT_LT(secondsOf([&] { EXPECT_EQ(daemon.terminate(), 0); }), patienceSeconds);
+        for (const bool boot : {true, false}) {
+            daemon.start(boot ? std::vector<std::string>{"--forget-boot"} : std::vector<std::string>());
+            EXPECT_TRUE(serves(daemon, second));
+            EXPECT_TRUE(isAnswered(daemon, [](auto& client) { return client.createOrLookup(dataContainer("other")); }));
+            EXPECT_LT(secondsOf([&] { EXPECT_EQ(daemon.terminate(), 0); }), patienceSeconds);
+        }
+        EXPECT_LT(secondsOf([&] { (void)daemon.tool({"check"}); }), patienceSeconds);
+        hanging.reset();
+        daemon.start();
+        EXPECT_TRUE(serves(daemon, mobile)) << daemon.log();
+    }
+}
+
+} // namespace zor::whole
