@@ -31,6 +31,8 @@ void Look::addUser(std::uint32_t userId) {
     const int error = home ? system_.fileManager().resolver().status(*home, status) : home.error();
     if (error == ENOENT && entry)
         homeless_.insert(userId);
+    if (error == 0 && system_.fileManager().resolver().status(StorePlaces::userBaseDirectory(*home), status) == ENOENT)
+        homeless_.insert(userId);
     if (error == 0)
         users_.push_back({userId, std::move(*home)});
     else if (error != ENOENT)

@@ -36,7 +36,8 @@ public:
     /// Those that have a home, so far as it can be looked at.
     [[nodiscard]] const std::vector<MobileUser>& users() const { return users_; }
 
-    /// Whether it is an account of a mobile user whose home is not there now.
+    /// Whether it is an account of a mobile user whose home is not there now, or holds no place for containers, as one
+    /// that has not been mounted.
     [[nodiscard]] bool lacksHome(std::uint32_t userId) const { return homeless_.contains(userId); }
 
     /// Adds a finding and gives it for more to be filled in. `url` is what it is about.

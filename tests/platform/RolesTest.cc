@@ -371,6 +371,11 @@ TEST(FileProtectionClass, RefusesWhatALockTakesAway) {
         EXPECT_EQ(protection.classOf(file.get()), 3) << text;
     }
     EXPECT_EQ(protection.setClass(-1, 1), EBADF);
+    // What an encryption keeps from being read can be opened for its path alone.
+    const FileDescriptor path(::open(test.path("file").c_str(), O_PATH | O_CLOEXEC));
+    EXPECT_EQ(protection.setClass(path.get(), 4), 0);
+    EXPECT_EQ(protection.classOf(path.get()), 4);
+    EXPECT_EQ(protection.classOf(file.get()), 4);
 }
 
 // One daemon on one root, and the lock goes with the process however it ends.
