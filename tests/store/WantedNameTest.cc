@@ -21,6 +21,11 @@ struct Row {
     ErrorCode code = ErrorCode::success;
 };
 
+ZORClientConnection::ContainerAddress addressOf(const FoundContainer& container) {
+    const ZORMetadata& record = *container.record;
+    return {record.uid(), container.uuid, record.identifier(), record.containerClass()};
+}
+
 std::function<ErrorCode(World&)> creating(bool transient) {
     return [transient](World& world) { return codeOf(world.create("com.example.new", application, transient)); };
 }
@@ -28,9 +33,32 @@ std::function<ErrorCode(World&)> creating(bool transient) {
 std::function<ErrorCode(World&)> repairing(const char* identifier, ContainerClass containerClass) {
     return [=](World& world) {
         const auto found = world.find(identifier, containerClass);
-        return codeOf(world.daemonsClient().recreateDefaultStructureForUser(
-            {ownerOf(containerClass), found->uuid, identifier, containerClass}));
+        return codeOf(world.daemonsClient().recreateDefaultStructureForUser(addressOf(*found)));
     };
+}
+
+ErrorCode renaming(World& world) {
+    return codeOf(world.daemonsClient().regenerateDirectoryUUIDForUser(addressOf(*world.find("app"))));
+}
+
+ErrorCode measuring(World& world) {
+    const auto measured = world.daemonsClient().diskUsageForUserId(addressOf(*world.find("app")));
+    EXPECT_EQ(measured.bytes, 0U);
+    return measured.error;
+}
+
+ErrorCode replacing(World& world) {
+    const auto old = world.find("app");
+    const auto fresh = world.make("app", application, asTransient);
+    return codeOf(world.daemonsClient().replaceContainer({.oldUuid = old->uuid,
+                                                          .newUuid = fresh.uuid,
+                                                          .userIdOld = mobile,
+                                                          .userIdNew = mobile,
+                                                          .identifierOld = "app",
+                                                          .identifierNew = "app",
+                                                          .classOld = application,
+                                                          .classNew = application},
+                                                         StartDeletionThread::no));
 }
 
 ErrorCode booting(World& world) {
@@ -97,6 +125,10 @@ TEST(WantedName, GivesNothingAway) {
         {"class of what comes back", second, applications, recovering, ErrorCode::journalUnusable},
         {"transient base", 0, temp, creating(true), notMoved},
         {"transient class", second, transients, creating(true), notMoved},
+        {"container", second, "APP", repairing("app", application), notMade},
+        {"container's name", 0, "APP", renaming, ErrorCode::directoryNotRenamed},
+        {"container's size", second, "APP", measuring},
+        {"container that is replaced", 0, "APP", replacing, ErrorCode::oldNotMovedToStaging},
         {"subdirectory", 0, "APP/Documents", repairing("app", application), notMade},
         {"subdirectory's", second, "APP/Library/Caches", repairing("app", application), notMade},
         {"group's", second, "GROUP/Library/Caches", repairing("systemgroup.x", group), notMade},
@@ -118,6 +150,7 @@ TEST(WantedName, GivesNothingAway) {
         world.makeDirectories(wanted, row.owner, 0700);
         world.write(wanted + "/sub/secret", "s", 0600);
         world.write(wanted + "/Data/file", "s", 0600);
+        world.write(wanted + "/" + names::metadataFile, "", 0600);
         const std::string before = support::readTree(world.path(wanted)).describe();
         EXPECT_EQ(row.request(world), row.code);
         EXPECT_EQ(world.item(wanted), directoryOf(row.owner, 0700));

@@ -71,6 +71,11 @@ Result<std::uint64_t> ZORClientConnection::diskUsage(const ContainerAddress& add
                 return *kept;
         container = record->url();
         directory = services_.fileManager.resolver().openDirectory(container);
+        // What another keeps in a directory that was renamed to the container's name is not told.
+        if (directory && !services_.fileManager.judgeOwner(
+                             directory->get(), container,
+                             ZORGlobalConfiguration::ownerOfClassDirectory(address.containerClass, address.userId)))
+            directory = std::unexpected(EPERM);
     }
     const fs::Usage usage = [&] {
         const platform::BlockingScope blocking; // a large tree must not take one of the few threads from all clients

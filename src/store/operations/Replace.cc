@@ -211,11 +211,12 @@ Result<void> ZORClientConnection::moveOldAway(const ReplaceRequest& request, Rep
         return makeError(log, here, ErrorCode::oldNotMovedToStaging, &cause, LogFlag::yes,
                          "Failed to move old %s to staging %s", progress.oldUrl.c_str(), stagingUrl.c_str());
     };
-    // Whoever owns them may have put something else in their places.
+    // Whoever owns them may have put something else, or another's directory, in their places.
+    const std::uint32_t owner =
+        ZORGlobalConfiguration::ownerOfClassDirectory(request.classNew, progress.newRecord->uid());
     for (const FileURL* url : {&progress.oldUrl, &progress.newUrl})
-        if (const auto opened = services_.fileManager.resolver().openDirectory(*url); !opened)
-            return oldNotMoved(
-                posixError(here, opened.error(), "open of %s failed: %s", url->c_str(), errorText(opened.error())));
+        if (const auto opened = services_.fileManager.openDirectoryOf(owner, *url); !opened)
+            return oldNotMoved(opened.error());
     if (const auto opened = openDirectories(progress, stagingUrl); !opened)
         return oldNotMoved(opened.error());
     if (request.preserveOldUuid == PreserveOldUUID::yes) {

@@ -73,8 +73,10 @@ Result<void> ZORClientConnection::regenerateDirectoryUUIDForUser(const Container
             place = oldUrl.deletingLastPathComponent();
             const FileURL newUrl = place.appendingDirectory(UUID::random().string());
             const auto moved = [&]() -> Result<void> {
-                const auto directory = TRY(services_.fileManager.openDirectoryOf(
-                    ZORGlobalConfiguration::ownerOfClassDirectory(address.containerClass, address.userId), place));
+                const std::uint32_t owner =
+                    ZORGlobalConfiguration::ownerOfClassDirectory(address.containerClass, address.userId);
+                const auto directory = TRY(services_.fileManager.openDirectoryOf(owner, place));
+                TRY(services_.fileManager.openDirectoryOf(owner, oldUrl));
                 TRY(services_.fileManager.moveItem(directory.get(), oldUrl, directory.get(), newUrl));
                 return {};
             }();
