@@ -12,8 +12,9 @@ using platform::MutexLock;
 
 bool BoundedQuestion::begin(const std::shared_ptr<State>& state, std::function<void()> question) {
     try {
-        std::thread([state, question = std::move(question)] {
+        std::thread([state, question = std::move(question)]() mutable {
             question();
+            question = nullptr; // who waits finds nothing held any more by what was asked
             const MutexLock held(state->mutex);
             state->done = state->begun;
             state->late = false;
