@@ -19,6 +19,7 @@
 #include <malloc.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
+#include <unistd.h>
 #include <utility>
 
 namespace {
@@ -61,6 +62,9 @@ platform::Syncs syncsFromEnvironment() {
     return wanted && std::strcmp(wanted, "none") == 0 ? platform::Syncs::off : platform::Syncs::on;
 }
 
+/// How long the threads that serve clients may take to end. A kill is safe at any moment, so nothing is lost by it.
+constexpr unsigned stopSecondsMax = 10;
+
 /// Ends the run loop on SIGTERM or SIGINT, as soon as nothing is under way.
 class StopOnSignal {
 public:
@@ -76,8 +80,12 @@ public:
 
 private:
     void stopIfWanted() {
-        if (wanted_ && transactions_.count() == 0)
-            loop_.stop();
+        if (!wanted_ || transactions_.count() != 0)
+            return;
+        // A request that waits for a file system that has died would keep the process for ever.
+        std::signal(SIGALRM, [](int) { ::_exit(0); });
+        ::alarm(stopSecondsMax);
+        loop_.stop();
     }
 
     platform::SignalDescriptor signals_{SIGTERM, SIGINT};

@@ -157,6 +157,8 @@ bool UpcallServer::lookUp(const ProcessContainersRequest& request, ProcessContai
     client.setAllowOtherIdLookup(true);
     client.setAllowGroupIdLookup(true);
     Lookups lookups(log_, client);
+    // Asked before any lock is taken: of a home that does not answer the lookups are then told at once.
+    (void)services_.configuration.homeAnswers(request.personaId);
     if (const std::string* identifier = request.dataContainerIdentifier())
         found.dataContainer = lookups.pathOf(request.personaId, *identifier, ContainerClass::dataApplication,
                                              "createOrLookupContainerForUser:");
