@@ -12,6 +12,7 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <sys/socket.h>
+#include <sys/time.h>
 #include <sys/un.h>
 
 namespace zorvane {
@@ -48,6 +49,18 @@ sockaddr_un addressOf(const std::string& path, const std::string& name, int dire
     return address;
 }
 
+/// A connect waits for room among those who have not been accepted yet: of a daemon that is still starting, other users
+/// can take all of it.
+void limitConnecting(int socket, std::uint32_t timeoutMilliseconds) {
+    const timeval limit{.tv_sec = timeoutMilliseconds / 1000,
+                        .tv_usec = static_cast<suseconds_t>(timeoutMilliseconds % 1000) * 1000};
+    (void)::setsockopt(socket, SOL_SOCKET, SO_SNDTIMEO, &limit, sizeof limit); // all zero: no limit
+}
+
+std::unexpected<Error> tooLate(std::uint32_t timeoutMilliseconds) {
+    return fail(Error::Kind::timedOut, "zorvaned did not answer within " + std::to_string(timeoutMilliseconds) + " ms");
+}
+
 constexpr std::size_t replyBytesFirst = std::size_t{64} * 1024;
 constexpr std::size_t replyBytesMax = std::size_t{1}
                                       << 30; // a list of every container of a large device takes a few MiB
@@ -68,7 +81,11 @@ Result<Client::Connection> Client::Connection::open(const ConnectOptions& option
     if (!socket.valid())
         return fail(Error::Kind::unreachable, withReason("cannot make a socket", errno));
     const sockaddr_un address = addressOf(path, name, directory.get());
-    if (::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0)
+    limitConnecting(socket.get(), options.timeoutMilliseconds);
+    const bool connected = ::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
+    if (!connected && errno == EAGAIN)
+        return tooLate(options.timeoutMilliseconds);
+    if (!connected)
         return fail(Error::Kind::unreachable, withReason("cannot reach zorvaned at " + path, errno));
     return Connection(std::move(socket), options);
 }
@@ -89,8 +106,7 @@ Result<void> Client::Connection::waitFor(short events) {
         if (ready > 0)
             return {};
         if (ready == 0)
-            return fail(Error::Kind::timedOut,
-                        "zorvaned did not answer within " + std::to_string(timeoutMilliseconds_) + " ms");
+            return tooLate(timeoutMilliseconds_);
         if (errno != EINTR)
             return fail(Error::Kind::unreachable, withReason("cannot wait for zorvaned", errno));
     }

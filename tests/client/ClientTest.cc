@@ -269,7 +269,13 @@ TEST(Client, TimeRunsOut) {
         const auto begin = std::chrono::steady_clock::now();
         const auto done = client.emptyDeathRow();
         const auto taken = std::chrono::steady_clock::now() - begin;
+        // Nor does a connect, where others have taken all the room for those who wait.
+        std::vector<Client> waiting;
+        auto another = Client::connect(daemon.options(150));
+        for (; another && waiting.size() < 8; another = Client::connect(daemon.options(150)))
+            waiting.push_back(std::move(*another));
         over.set_value();
+        EXPECT_TRUE(!another && another.error().kind == Kind::timedOut);
         EXPECT_TRUE(!done && done.error().kind == Kind::timedOut);
         EXPECT_GE(taken, std::chrono::milliseconds(150));
         EXPECT_LT(taken, std::chrono::seconds(5));

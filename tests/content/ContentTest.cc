@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "content/Content.h"
 #include "archives/ArchiveMaker.h"
+#include "content/ContainerDirectory.h"
 #include "content/Decoder.h"
 #include "content/ItemRules.h"
 #include "content/Powerless.h"
@@ -696,6 +697,27 @@ protected:
         return made;
     }
 };
+
+// Goal: nothing is written into what only stands in a new container's place. Method: another user's directory there,
+// with no record of the daemon's, with one that its owner made, with a link; and the container itself.
+TEST(Content, AnotherDirectoryInTheContainersPlace) {
+    if (::geteuid() != 0)
+        GTEST_SKIP() << "only root can make another user's directory";
+    const World world;
+    EXPECT_TRUE(openContainer(world.path("/container")));
+    for (const bool forged : {false, true}) {
+        const std::string other = world.path(forged ? "/forged" : "/other");
+        ::mkdir(other.c_str(), 0755);
+        if (forged) {
+            writeFile(other + "/" + metadata, "whose it is");
+            ::chown((other + "/" + metadata).c_str(), ownerId + 1, ownerId + 1);
+        }
+        ::chown(other.c_str(), ownerId + 1, ownerId + 1);
+        EXPECT_FALSE(openContainer(other)) << other;
+    }
+    ::symlink("container", world.path("/link").c_str());
+    EXPECT_FALSE(openContainer(world.path("/link")));
+}
 
 // Goal: what another program of root's keeps closed in the container does not come out of it. Method: its directory is
 // swapped in for the one that the installer makes, before that is opened.

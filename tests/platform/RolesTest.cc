@@ -19,6 +19,7 @@
 #include <filesystem>
 #include <functional>
 #include <span>
+#include <sys/file.h>
 #include <sys/wait.h>
 #include <sys/xattr.h>
 #include <unistd.h>
@@ -390,11 +391,28 @@ TEST(DaemonLock, HoldsOffASecondDaemon) {
     int status = 0;
     ASSERT_EQ(::waitpid(child, &status, WUNTRACED), child);
     EXPECT_TRUE(WIFSTOPPED(status));
+    EXPECT_TRUE(DaemonLock::isHeld(test.root()));
     const auto second = DaemonLock::take(test.root());
     ASSERT_FALSE(second);
     EXPECT_EQ(second.error(), EWOULDBLOCK);
     ::kill(child, SIGKILL);
     ::waitpid(child, nullptr, 0);
+    EXPECT_FALSE(DaemonLock::isHeld(test.root()));
+    if (::geteuid() == 0) {
+        // Another user's lock on an inode of that number is none of a daemon's. Here it is the file itself.
+        const pid_t other = ::fork();
+        if (other == 0) {
+            const int file = ::open(test.path("run/zorvane/zorvaned.lock").c_str(), O_RDWR);
+            const bool held = ::flock(file, LOCK_EX) == 0 && ::setuid(501) == 0;
+            ::kill(::getpid(), held ? SIGSTOP : SIGTERM);
+            ::_exit(0);
+        }
+        ASSERT_EQ(::waitpid(other, &status, WUNTRACED), other);
+        EXPECT_TRUE(WIFSTOPPED(status));
+        EXPECT_FALSE(DaemonLock::isHeld(test.root()));
+        ::kill(other, SIGKILL);
+        ::waitpid(other, nullptr, 0);
+    }
     EXPECT_TRUE(DaemonLock::take(test.root()));
     EXPECT_EQ(test.read("run/zorvane/zorvaned.lock"), std::to_string(::getpid()) + "\n");
 }

@@ -187,6 +187,23 @@ TEST_F(Dispatch, IdentifiersAndGroupsAreBounded) {
     EXPECT_EQ(registering("g", tooLong), 11U);
 }
 
+// Goal: no client without powers throws away what is just being installed. Method: it asks for the installer's and the
+// system's transient containers, which would, and for one of its own user's.
+TEST_F(Dispatch, TransientContainersOfOthersStay) {
+    asInstaller();
+    const plist::Data installing = makeContainer("app", 1, true);
+    as(grant("com.example", noPowers));
+    for (const auto& [containerClass, user, error] : {std::array{1, 33, 55}, {13, 499, 55}, {2, 501, 21}})
+        EXPECT_EQ(
+            errorOf(request(
+                {{"ContainerClass", containerClass}, {"UserID", user}, {"Identifier", "app"}, {"Transient", true}})),
+            static_cast<std::uint64_t>(error))
+            << containerClass;
+    asInstaller();
+    const Dictionary left = request({{"Command", 1}, {"ContainerClass", 1}, {"UserID", 33}, {"Transient", true}});
+    EXPECT_EQ(*left.array("ReplyUUIDsArray"), Array{installing});
+}
+
 TEST_F(Dispatch, Lists) {
     asInstaller();
     const Dictionary list{{"Command", 1}, {"ContainerClass", 2}, {"UserID", 1}};

@@ -42,8 +42,13 @@ bool fence(Network network) {
     filter.refuse(SYS_io_uring_setup, ENOSYS);
     for (const std::uint32_t request : {TIOCSTI, TIOCLINUX})
         filter.refuseValue(SYS_ioctl, ioctlRequest, request, EPERM);
-    if (network == Network::none)
+    if (network == Network::none) {
         filter.refuseUnless(SYS_socket, socketFamily, {AF_UNIX, AF_INET, AF_INET6, AF_NETLINK}, EAFNOSUPPORT);
+#ifdef SYS_socketcall
+        // Some architectures have it beside the calls that it stands for. Its family lies in memory, too.
+        filter.refuse(SYS_socketcall, ENOSYS);
+#endif
+    }
     return filter.layOn(zor::platform::SystemCallFilter::Rest::allowed);
 }
 

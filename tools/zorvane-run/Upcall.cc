@@ -49,6 +49,9 @@ Result<FileDescriptor> connectTo(const Root& root) {
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
     std::memcpy(address.sun_path, shortPath.data(), std::min(shortPath.size(), sizeof address.sun_path - 1));
+    const timeval patience{.tv_sec = answerSeconds, .tv_usec = 0};
+    (void)::setsockopt(socket.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
+    (void)::setsockopt(socket.get(), SOL_SOCKET, SO_SNDTIMEO, &patience, sizeof patience);
     if (::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0)
         return failed(withReason("cannot reach zorvaned at " + path, errno), advice);
     ucred server{};
@@ -56,9 +59,6 @@ Result<FileDescriptor> connectTo(const Root& root) {
     if (::getsockopt(socket.get(), SOL_SOCKET, SO_PEERCRED, &server, &length) != 0 || server.uid != 0)
         return failed("what serves " + path + " does not run as root",
                       "use the root of a daemon that does: only such a one can give containers to users");
-    const timeval patience{.tv_sec = answerSeconds, .tv_usec = 0};
-    (void)::setsockopt(socket.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
-    (void)::setsockopt(socket.get(), SOL_SOCKET, SO_SNDTIMEO, &patience, sizeof patience);
     return socket;
 }
 

@@ -13,21 +13,16 @@
 #include "Commands.h"
 #include "KnownContainer.h"
 #include "ProgressDisplay.h"
+#include "content/ContainerDirectory.h"
 #include "content/Content.h"
 #include "platform/linux/LinuxDisk.h"
-#include "platform/linux/Openat2.h"
 
 #include <algorithm>
-#include <cerrno>
 #include <csignal>
-#include <fcntl.h>
 #include <initializer_list>
-#include <sys/stat.h>
-#include <unistd.h>
 
 namespace zorvanectl {
 
-using zor::platform::FileDescriptor;
 using zorvane::Client;
 
 namespace {
@@ -84,7 +79,6 @@ private:
     int failed(const std::string& message);
     /// What became of the transient container, for the end of a message.
     std::string discard();
-    [[nodiscard]] content::Outcome<FileDescriptor> openContainer() const;
 
     const zorvane::ConnectOptions& connect_;
     const Output& output_;
@@ -141,7 +135,7 @@ int Installation::install(Client& client) {
               .user = userOf(target_),
               .identifier = target_.identifier,
               .uuid = made->uuid};
-    const auto container = openContainer();
+    const auto container = content::openContainer(freshPath_);
     if (!container)
         return failed(container.error().what);
     {
@@ -166,20 +160,6 @@ int Installation::install(Client& client) {
     if (!again)
         return failed(again.error().message);
     return replace(*again);
-}
-
-content::Outcome<FileDescriptor> Installation::openContainer() const {
-    const FileDescriptor root(::open("/", O_PATH | O_DIRECTORY | O_CLOEXEC));
-    const char* const path = freshPath_.c_str();
-    auto container =
-        zor::platform::openBeneath(root.get(), path[0] == '/' ? path + 1 : path, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
-    if (!container)
-        return content::failed("the new container cannot be opened", container.error());
-    // Its owner may have put another directory in its place; one of root's must not get content that root writes.
-    struct stat status{};
-    if (::fstat(container->get(), &status) != 0 || (::geteuid() == 0 && (status.st_uid == 0) != (fresh_.user == 0)))
-        return content::failed("somebody put something else in the place of the new container");
-    return std::move(*container);
 }
 
 int Installation::replace(Client& client) {

@@ -32,7 +32,7 @@ using Result = std::expected<T, Error>;
 struct ConnectOptions {
     /// The system root that the daemon works on.
     std::string root = "/";
-    /// For each call; 0 waits for ever.
+    /// For connecting, and for each call; 0 waits for ever.
     std::uint32_t timeoutMilliseconds = 0;
 };
 

@@ -10,6 +10,19 @@ namespace keys = ipc::keys;
 
 namespace {
 
+/// A transient container that is asked for again is thrown away, and those of the installer and of the system belong to
+/// no client: what somebody is just installing is in one. False, logged: the context has its error.
+bool mayAskForTransient(CommandContext& context, const std::string* identifier, ContainerClass containerClass) {
+    if (isPerUserClass(containerClass) || context.client->allowOtherIdLookup())
+        return true;
+    makeError(context.log, ZOR_HERE, ErrorCode::notEntitled, nullptr, LogFlag::yes,
+              "%s may not ask for the transient container of %s in class %ld: it is the installer's or the system's",
+              ZOR_SHOWN(context.client->clientBundleIdentifier()), ZOR_SHOWN(identifier),
+              static_cast<long>(containerClass));
+    context.error = ErrorCode::notEntitled;
+    return false;
+}
+
 void replyWithList(CommandContext& context, const std::vector<ZORClientConnection::ListedContainer>& containers) {
     plist::Array identifiers;
     plist::Array uuids;
@@ -29,12 +42,13 @@ void createOrLookupContainer(CommandContext& context) {
     const ContainerClass containerClass = classOf(context.request, keys::containerClass);
     const auto user = userOf(context, keys::userId, containerClass);
     const std::string* identifier = ownIdentifierByDefault(context);
-    if (!user || !mayAskFor(context, identifier))
+    const bool transient = context.request.isTrue(keys::transient);
+    if (!user || !mayAskFor(context, identifier) ||
+        (transient && !mayAskForTransient(context, identifier, containerClass)))
         return;
     const auto found = context.client->createOrLookupContainerForUser(
         *user, identifier, containerClass,
-        {.createIfNecessary = context.request.isTrue(keys::createIfNecessary),
-         .transient = context.request.isTrue(keys::transient)});
+        {.createIfNecessary = context.request.isTrue(keys::createIfNecessary), .transient = transient});
     if (!found) {
         context.error = found.error().replyCode();
         return;

@@ -7,9 +7,9 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdio>
 #include <fcntl.h>
 #include <string>
-#include <string_view>
 #include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -21,6 +21,19 @@ namespace {
 constexpr mode_t lockMode = 0600;
 /// A line of /proc/locks is about 60 bytes.
 constexpr std::size_t lockListBytesMax = std::size_t{16} << 20;
+/// Whether a line of the list is about a lock on that inode which its file's owner holds. "1: FLOCK  ADVISORY  WRITE
+/// 4711 00:1c:12345 0 EOF". Stacked file systems give the device of a lower one, so the inode alone has to do; and
+/// everybody can make one with that number somewhere, so the process counts too.
+bool isOwnersLock(const std::string& line, const struct stat& file) {
+    int process = 0;
+    unsigned long long inode = 0;
+    if (std::sscanf(line.c_str(), "%*d: FLOCK %*s WRITE %d %*x:%*x:%llu ", &process, &inode) != 2 ||
+        inode != file.st_ino)
+        return false;
+    struct stat status{};
+    return ::stat(("/proc/" + std::to_string(process)).c_str(), &status) == 0 && status.st_uid == file.st_uid;
+}
+
 } // namespace
 
 std::expected<DaemonLock, int> DaemonLock::take(const SystemRoot& root) {
@@ -51,14 +64,9 @@ bool DaemonLock::isHeld(const SystemRoot& root) {
     const auto locks = file.valid() ? readSmallFile(file.get(), lockListBytesMax) : std::unexpected(errno);
     if (!locks)
         return false;
-    // "1: FLOCK  ADVISORY  WRITE 4711 00:1c:12345 0 EOF". Stacked file systems give the device of a lower one, so the
-    // inode alone has to do.
-    const std::string inode = ":" + std::to_string(status.st_ino) + " ";
     for (std::size_t begin = 0; begin < locks->size();) {
         const std::size_t end = std::min(locks->find('\n', begin), locks->size());
-        const std::string_view line(locks->data() + begin, end - begin);
-        if (line.find(" FLOCK ") != line.npos && line.find(" WRITE ") != line.npos && line.find(inode) != line.npos &&
-            line.find("->") == line.npos)
+        if (isOwnersLock(locks->substr(begin, end - begin), status))
             return true;
         begin = end + 1;
     }
