@@ -166,7 +166,7 @@ ErrorText errorText(std::uint64_t code) {
     // An errno that would read as a code of the daemon's own comes with an offset.
     constexpr std::uint64_t errnoOffset = 1000;
     const std::uint64_t number = code > errnoOffset ? code - errnoOffset : code;
-    if (const char* const text = number < 200 ? ::strerrordesc_np(static_cast<int>(number)) : nullptr)
+    if (const char* const text = number > 0 && number < 200 ? ::strerrordesc_np(static_cast<int>(number)) : nullptr)
         return {text, "the system refused a step of the request for this reason",
                 "what was done before that step stays done", seeLog};
     return {"the daemon met an error that this client does not know", "the daemon is newer than the client",
