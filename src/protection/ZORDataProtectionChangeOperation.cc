@@ -8,6 +8,7 @@
 #include <chrono>
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <sys/sysmacros.h>
 #include <thread>
 
 namespace zor {
@@ -30,6 +31,17 @@ constexpr std::chrono::milliseconds retryInterval{20};
 
 unsigned long long number(ContainerClass containerClass) {
     return static_cast<unsigned long long>(containerClass);
+}
+
+/// Absent when it cannot be told.
+std::optional<DirectoryIdentity> identityOf(int directory) {
+    struct statx status{};
+    if (::statx(directory, "", AT_EMPTY_PATH | AT_STATX_DONT_SYNC, STATX_INO | STATX_BTIME, &status) != 0)
+        return std::nullopt;
+    return DirectoryIdentity{.device = makedev(status.stx_dev_major, status.stx_dev_minor),
+                             .inode = status.stx_ino,
+                             .birthSeconds = status.stx_btime.tv_sec,
+                             .birthNanoseconds = status.stx_btime.tv_nsec};
 }
 
 } // namespace
@@ -100,36 +112,47 @@ Result<ZORDataProtectionChangeOperation::NeedRetry> ZORDataProtectionChangeOpera
     std::vector<Item> items;
     platform::FileDescriptor container;
     {
-        const AllIdentifiersLock lock(services_.locks, LockMode::reading);
+        const IdentifierLock lock(services_.locks, dataContainerMetadata_->uuid().string(), LockMode::reading);
         TRY(checkStillThere());
         items = existingItems();
-        if (items.empty())
-            return NeedRetry::no;
         container = TRY(openContainer(items));
     }
     const auto walked = walk(container.get(), items);
     if (!walked && walked.error().isPosix(EPERM))
         return NeedRetry::yes;
     TRY(walked);
-    const AllIdentifiersLock lock(services_.locks, LockMode::reading);
+    // Nothing may come between the look and the record: else what is recorded could be of a container that has gone.
+    const IdentifierLock lock(services_.locks, dataContainerMetadata_->uuid().string(), LockMode::writing);
     TRY(checkStillThere());
+    const auto now = services_.fileManager.resolver().openDirectoryPath(dataContainerMetadata_->url());
+    const auto identity = now ? identityOf(now->get()) : std::nullopt;
+    if (!identity || identity != identityOf(container.get()))
+        return changedMeanwhile();
+    if (recordBlock_)
+        recordBlock_();
     return NeedRetry::no;
+}
+
+ZORError ZORDataProtectionChangeOperation::changedMeanwhile() {
+    return makeError(services_.log, {passFunction, __LINE__}, ErrorCode::pathNotAsExpected, nullptr, LogFlag::yes,
+                     "Cancelling data protection operation because container path changed on disk. This indicates "
+                     "the app may have been updated and changed its protection level.");
 }
 
 Result<void> ZORDataProtectionChangeOperation::checkStillThere() {
     const ZORMetadata& container = *dataContainerMetadata_;
-    const auto found = services_.sharedClientConnection->createOrLookupContainerForUser(
-        container.uid(), &container.identifier(), container.containerClass(),
-        {.createIfNecessary = false, .transient = false, .useLocking = UseLocking::no});
+    // Whatever else the identifier leads to, its record may be in another's hands: it is looked for, and not looked at.
+    const auto found =
+        services_.cache.containerForUser(container.uid(), container.containerClass(), &container.identifier(), false);
     if (!found)
         return makeError(services_.log, {passFunction, __LINE__}, ErrorCode::notFound, &found.error(), LogFlag::yes,
                          "Failed to lookup container to set data protection for userId: %u, identifier: %s, Class: "
                          "%llu",
                          container.uid(), ZOR_SHOWN(container.identifier()), number(container.containerClass()));
-    if (found->path != container.url().path())
-        return makeError(services_.log, {passFunction, __LINE__}, ErrorCode::pathNotAsExpected, nullptr, LogFlag::yes,
-                         "Cancelling data protection operation because container path changed on disk. This indicates "
-                         "the app may have been updated and changed its protection level.");
+    const auto same = services_.cache.containerForUser(container.uid(), container.containerClass(),
+                                                       &container.identifier(), container.uuid().string());
+    if (!same || !*same || (*same)->transient() || (*same)->url() != container.url())
+        return changedMeanwhile();
     return {};
 }
 
@@ -159,6 +182,12 @@ Result<platform::FileDescriptor> ZORDataProtectionChangeOperation::openContainer
         return posixError({passFunction, __LINE__}, number, "fts_open failed for %s : %s", shown(items).c_str(),
                           errorText(number));
     }
+    // While the change waited, another one may have come to the same place.
+    const auto identity = identityOf(opened->get());
+    if (!firstMet_)
+        firstMet_ = identity;
+    if (identity != firstMet_)
+        return changedMeanwhile();
     owner_ = status.st_uid;
     return std::move(*opened);
 }

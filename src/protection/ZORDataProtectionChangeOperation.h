@@ -6,10 +6,9 @@
 // never by a name; nothing outside the container is touched. A file that has names outside is left as it is, and so is
 // one with several names that does not belong to the container's owner: he can make its names seem to be all inside.
 //
-// A pass holds a lock while it looks the container up and opens it, and again afterwards to see that it is still the
-// same container at the same place; not in between, since every lookup of any client waits for such locks. The lookup
-// goes by identifier and may come upon another container's record: so the lock is the all-identifiers lock, for
-// reading, which keeps out all that the container's own lock would.
+// A pass holds the container's lock while it looks the container up and opens it, and again afterwards to see that the
+// directory which it walked lies in the container's place still, and to record the change; not in between, since every
+// lookup of any client waits for such locks. A wipe keeps path and UUID: only the directory itself tells it.
 //
 // A stop in the middle leaves some files changed and nothing recorded; the same request, sent again, does the rest.
 //
@@ -25,6 +24,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <sys/types.h>
 #include <vector>
 
 namespace zor {
@@ -36,6 +36,15 @@ inline constexpr std::int32_t files = 2;
 /// Leave a file alone when the number of its class is lower than the new one.
 inline constexpr std::int32_t keepLower = 4;
 } // namespace protectionChange
+
+/// Tells a directory from one that has its name, or its inode's number, later.
+struct DirectoryIdentity {
+    dev_t device = 0;
+    std::uint64_t inode = 0;
+    std::int64_t birthSeconds = 0; // 0 where the file system does not say
+    std::uint32_t birthNanoseconds = 0;
+    bool operator==(const DirectoryIdentity&) const = default;
+};
 
 class ZORDataProtectionChangeOperation : public std::enable_shared_from_this<ZORDataProtectionChangeOperation> {
 public:
@@ -56,6 +65,9 @@ public:
 
     /// Runs once, before the first retry.
     void setRetryStartBlock(std::function<void()> block) { retryStartBlock_ = std::move(block); }
+    /// Runs once, when a pass has changed all there is, under the container's lock, held for writing. The container is
+    /// the one that the change was asked for.
+    void setRecordBlock(std::function<void()> block) { recordBlock_ = std::move(block); }
     /// Runs once, when the operation ends.
     void setCompletionBlock(CompletionBlock block) { completionBlock_ = std::move(block); }
 
@@ -73,8 +85,9 @@ private:
     /// Calls the completion, unless a retry is queued.
     void conclude(const Result<NeedRetry>& attempted);
 
-    /// Errors 21, 10.
+    /// Errors 21, 10. The caller holds the container's lock.
     Result<void> checkStillThere();
+    ZORError changedMeanwhile();
     struct Item {
         std::string name;
         std::string path;
@@ -100,7 +113,9 @@ private:
     const std::int32_t operationType_;
     bool retried_ = false;
     std::function<void()> retryStartBlock_;
+    std::function<void()> recordBlock_;
     CompletionBlock completionBlock_;
+    std::optional<DirectoryIdentity> firstMet_;
     // Of one pass.
     uid_t owner_ = 0; // the container's
     fs::NamesMet namesMet_;

@@ -6,9 +6,6 @@
 #include "protection/ZORDataProtectionChangeOperation.h"
 #include "store/StoreServices.h"
 
-#include <cmath>
-#include <limits>
-
 namespace zor {
 
 using platform::MutexLock;
@@ -22,16 +19,6 @@ constexpr const char* function = "setDataProtectionOnDataContainerForUser";
 constexpr int classNeverAllowed = 2;
 /// The last of those that applications of others may ask for.
 constexpr int classMaxOfOthers = 3;
-
-int recordedClass(const ZORMetadata& container) {
-    const plist::Value* value =
-        container.info() ? container.info()->find(ipc::infoKeys::contentProtectionClass) : nullptr;
-    if (!value)
-        return platform::defaultProtectionClass;
-    if (const double* real = value->asReal(); real && std::abs(*real) <= std::numeric_limits<int>::max())
-        return static_cast<int>(*real);
-    return static_cast<int>(value->asSigned().value_or(platform::defaultProtectionClass));
-}
 
 /// Files are changed where the new class is stricter; else directories alone are.
 std::int32_t changeType(int current, int requested) {
@@ -101,7 +88,7 @@ std::vector<ZORDataProtectionManager::Pending> ZORDataProtectionManager::pending
 Result<std::shared_ptr<ZORDataProtectionChangeOperation>>
 ZORDataProtectionManager::prepare(const Request& request, const Completion& completion) {
     const auto container = TRY(containerOf(request));
-    const int current = recordedClass(*container);
+    const int current = container->recordedProtectionClass().value_or(platform::defaultProtectionClass);
     if (current == request.dataProtectionClass)
         return std::shared_ptr<Operation>();
     TRY(checkClass(request));
@@ -117,6 +104,7 @@ ZORDataProtectionManager::prepare(const Request& request, const Completion& comp
             services_.log, services_.assertions, change->container->identifier(),
             static_cast<std::uint8_t>(platform::TerminationReason::installation));
     });
+    operation->setRecordBlock([this, change] { record(*change); });
     operation->setCompletionBlock(
         [this, change](bool wasLocked, const std::optional<ZORError>& error) { finish(*change, wasLocked, error); });
     return operation;
@@ -172,8 +160,6 @@ void ZORDataProtectionManager::finish(Change& change, bool wasLocked, const std:
     if (wasLocked && change.request.retryIfLocked)
         services_.log.write(logLevelError, function, "Unexpectedly got completion block called with wasLocked");
     change.dropAssertion();
-    if (!wasLocked && !error)
-        record(change);
     change.end();
     change.completion(error ? error->replyCode() : ErrorCode::success);
 }
@@ -187,7 +173,7 @@ void ZORDataProtectionManager::record(const Change& change) {
                                                                           .uuid = container.uuid(),
                                                                           .identifier = container.identifier(),
                                                                           .containerClass = container.containerClass()},
-                                                                         UseLocking::yes);
+                                                                         UseLocking::no);
     if (!recorded)
         services_.log.write(logLevelError, function, "Failed to set protection class info for %s at %s to %d : %llu",
                             ZOR_SHOWN(container.identifier()), container.url().c_str(),

@@ -5,12 +5,15 @@
 #include "fs/Hidden.h"
 #include "fs/OwnedFile.h"
 #include "ipc/Identifier.h"
+#include "ipc/Keys.h"
 #include "plist/Binary.h"
 #include "plist/Read.h"
 #include "store/Names.h"
 
 #include <cerrno>
+#include <cmath>
 #include <fcntl.h>
+#include <limits>
 
 namespace zor {
 
@@ -70,6 +73,16 @@ FileURL ContainerPlace::url() const {
     path += '/';
     path += name();
     return FileURL::directory(std::move(path));
+}
+
+std::optional<int> ZORMetadata::recordedProtectionClass() const {
+    const plist::Value* value = info_ ? info_->find(ipc::infoKeys::contentProtectionClass) : nullptr;
+    if (!value)
+        return std::nullopt;
+    if (const double* real = value->asReal(); real && std::abs(*real) <= std::numeric_limits<int>::max())
+        return static_cast<int>(*real);
+    const auto number = value->asSigned();
+    return number ? std::optional(static_cast<int>(*number)) : std::nullopt;
 }
 
 plist::Dictionary ZORMetadata::fileContent() const {

@@ -61,6 +61,8 @@ public:
     [[nodiscard]] const std::string& identifier() const { return identifier_; }
     [[nodiscard]] const Info& info() const { return info_; }
     void setInfo(Info info) { info_ = std::move(info); }
+    /// The data-protection class that the info says the container was given last. Absent when it says none.
+    [[nodiscard]] std::optional<int> recordedProtectionClass() const;
     [[nodiscard]] bool hasUrl() const { return !place_.empty(); }
     [[nodiscard]] FileURL url() const { return place_.url(); }
     [[nodiscard]] const ContainerPlace& place() const { return place_; }
@@ -70,8 +72,8 @@ public:
     /// Whether it was found rather than made, when it was last asked for. Set by lookups, which may be several at once.
     [[nodiscard]] bool existed() const { return existed_.load(std::memory_order_relaxed); }
     void setExisted(bool existed) { existed_.store(existed, std::memory_order_relaxed); }
-    /// False from its creation until the move into its class directory has been synced; then true for ever. Changed
-    /// without the identifier locks.
+    /// False from a move into its place until that move has been synced: who finds it meanwhile syncs before it tells
+    /// anybody. Set to true without the identifier locks.
     [[nodiscard]] bool durable() const { return durable_.load(std::memory_order_acquire); }
     void setDurable(bool durable) { durable_.store(durable, std::memory_order_release); }
 

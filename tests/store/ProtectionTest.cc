@@ -5,6 +5,7 @@
 #include "protection/ZORDataProtectionChangeOperation.h"
 #include "protection/ZORDataProtectionManager.h"
 #include "support/LongRun.h"
+#include "support/OpenWatch.h"
 #include "world/World.h"
 
 #include <algorithm>
@@ -14,8 +15,6 @@
 #include <filesystem>
 #include <gtest/gtest.h>
 #include <mutex>
-#include <poll.h>
-#include <sys/fanotify.h>
 #include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -173,8 +172,9 @@ TEST_F(Protection, Requests) {
     }
     record(7);
     EXPECT_EQ(change(foreign(7)), 1U); // equality comes first
-    EXPECT_EQ(change(to(5)), 1U);
-    EXPECT_EQ(recorded(), 5);
+    EXPECT_EQ(change(to(257)), 1U);    // no class is cut to fewer bits
+    EXPECT_EQ(recorded(), 257);
+    EXPECT_EQ(classOf(path + "Documents"), 257);
 }
 
 // Goal: exactly the classes that the change's kind says. Method: recorded and requested class, files before and after.
@@ -252,7 +252,8 @@ TEST_F(Protection, WaitsForTheUnlock) {
                         "containerClass: 2"));
 }
 
-// Goal: a container moved, replaced or deleted while a change waits is not touched. Method: each before the unlock.
+// Goal: a container moved, replaced, wiped or deleted while a change waits, or while it is walked, is not recorded as
+// changed. Method: each before the unlock, then in the moment in which the walk opens a directory.
 TEST_F(Protection, TheContainerChangesMeanwhile) {
     struct Row {
         const char* name;
@@ -260,7 +261,9 @@ TEST_F(Protection, TheContainerChangesMeanwhile) {
         std::uint64_t code;
     };
     ZORClientConnection& client = world.daemonsClient();
+    const auto wipe = [&] { ASSERT_TRUE(client.deleteDataContainerContentForUser(mobile, &identifier, application)); };
     const Row rows[] = {
+        {"wiped", wipe, 10},
         {"renamed", [&] { ASSERT_TRUE(client.regenerateDirectoryUUIDForUser(address())); }, 10},
         {"replaced",
          [&] {
@@ -292,6 +295,27 @@ TEST_F(Protection, TheContainerChangesMeanwhile) {
         EXPECT_FALSE(recorded());
         EXPECT_FALSE(world.exists(assertionFile));
     }
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.name);
+        useContainer();
+        put("Documents/file", 4);
+        bool done = false;
+        const support::OpenWatch watch(container.path + "/Documents", [&] {
+            if (!std::exchange(done, true))
+                row.meanwhile();
+            return true;
+        });
+        if (!watch.works())
+            GTEST_SKIP() << "skipped: needs root, and a kernel that lets an open be watched";
+        EXPECT_EQ(change(to(1)), row.code);
+        EXPECT_TRUE(done);
+        EXPECT_FALSE(recorded());
+    }
+    // Asked for again, what took the place is changed as a whole.
+    useContainer();
+    put("Documents/file", 4);
+    EXPECT_EQ(change(to(1)), 1U);
+    EXPECT_EQ(recorded(), 1);
 }
 
 // Goal: changes that wait do not pile up, but for an owner of the root. Method: a small limit, and a locked device.
@@ -320,6 +344,9 @@ TEST_F(Protection, HostileOwner) {
     world.write("etc/outside/file", "x");
     files::create_directory_symlink(outside, documents / "link");
     files::create_hard_link(outside / "file", documents / "hard");
+    const std::string own = "private/var/mobile/own";
+    world.write(own, "x");
+    files::create_hard_link(world.path(own), documents / "own");
     ASSERT_EQ(::mkfifo((documents / "fifo").c_str(), 0666), 0);
     put("Documents/one", 3);
     put("Documents/leased", 3);
@@ -329,6 +356,7 @@ TEST_F(Protection, HostileOwner) {
     files::create_hard_link(documents / "one", container.path + "/Library/two");
     if (::geteuid() == 0) { // else all files are the owner's own
         ASSERT_EQ(::chown((documents / "one").c_str(), mobile, mobile), 0);
+        ASSERT_EQ(::chown((documents / "own").c_str(), mobile, mobile), 0);
         // Between the two directories the owner moves another's file on, so that its one name is met twice.
         world.disk().arm({.filter = [&](const auto&) {
             (void)::rename((documents / "hard").c_str(), (container.path + "/Library/hard").c_str());
@@ -340,6 +368,7 @@ TEST_F(Protection, HostileOwner) {
     leased.reset();
     EXPECT_EQ(classOf(path + "Documents/leased"), 1);
     EXPECT_EQ(classOf("etc/outside/file"), 3);
+    EXPECT_EQ(classOf(own), 3);                    // its other name is outside, though it is the same user's
     EXPECT_EQ(classOf(path + "Documents/one"), 1); // all its names are in the container
     EXPECT_EQ(std::ranges::count_if(world.log.take(),
                                     [](const support::LogLine& line) {
@@ -361,35 +390,6 @@ TEST_F(Protection, HostileOwner) {
     EXPECT_EQ(classOf("etc/outside/file"), 3);
     EXPECT_FALSE(world.exists(path + "tmp")); // an item that is missing is not made
 }
-
-/// Refuses every open of a file or directory, as one whom root lets watch it may.
-class OpenRefusal {
-public:
-    explicit OpenRefusal(const std::string& path)
-        : watch_(::fanotify_init(FAN_CLASS_CONTENT | FAN_CLOEXEC, O_RDONLY | O_CLOEXEC)) {
-        works_ = watch_.valid() &&
-                 ::fanotify_mark(watch_.get(), FAN_MARK_ADD, FAN_OPEN_PERM | FAN_ONDIR, AT_FDCWD, path.c_str()) == 0;
-        if (works_)
-            answering_ = std::jthread([this](const std::stop_token& stop) { answer(stop); });
-    }
-    [[nodiscard]] bool works() const { return works_; }
-
-private:
-    void answer(const std::stop_token& stop) {
-        pollfd waiting{.fd = watch_.get(), .events = POLLIN, .revents = 0};
-        fanotify_event_metadata event{};
-        while (!stop.stop_requested())
-            if (::poll(&waiting, 1, 1) == 1 && ::read(watch_.get(), &event, sizeof event) == sizeof event) {
-                const platform::FileDescriptor asked(event.fd);
-                const fanotify_response refused{.fd = event.fd, .response = FAN_DENY};
-                (void)!::write(watch_.get(), &refused, sizeof refused);
-            }
-    }
-
-    platform::FileDescriptor watch_;
-    bool works_ = false;
-    std::jthread answering_;
-};
 
 // Goal: the daemon's own files can be read while the device is locked. Method: their classes after each kind of write.
 TEST_F(Protection, FilesWithoutProtection) {
@@ -418,7 +418,7 @@ TEST_F(Protection, AForbiddenOpenIsNoLock) {
         SCOPED_TRACE(refused);
         Answers answers;
         {
-            const OpenRefusal refusal(refused);
+            const support::OpenWatch refusal(refused, [] { return false; });
             if (!refusal.works())
                 GTEST_SKIP() << "skipped: needs root, and a kernel that lets an open be refused";
             manager().setDataProtectionOnDataContainerForUser(request, answers.completion());
