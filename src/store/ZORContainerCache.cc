@@ -11,6 +11,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <fcntl.h>
+#include <set>
 
 namespace zor {
 
@@ -21,6 +22,14 @@ namespace {
 const char* suffix(bool transient) {
     return transient ? "(transient)" : "";
 }
+
+/// A look over a class directory after something has gone from it takes at most a hundredth of the time, and comes at
+/// most once a second: who owns the directory can make it necessary again and again.
+constexpr std::chrono::seconds lookOverPauseMin{1};
+constexpr int lookOverShare = 100;
+
+/// What the look for a metadata file gives for something else in its place; no errno.
+constexpr int isNoFile = -1;
 
 long number(ContainerClass containerClass) {
     return static_cast<long>(containerClass);
@@ -160,29 +169,75 @@ Result<ZORContainerCache::Found> ZORContainerCache::findRecord(const Key& key, c
     return Found{.record = found->record, .place = found->record->place()};
 }
 
-Result<void> ZORContainerCache::checkOnDisk(Here here, const Key& key, const Found& found,
+int ZORContainerCache::lookForFile(const Found& found) {
+    if (found.place.empty())
+        return EINVAL;
+    // A link or anything else in the file's place is no metadata file: the owner of the container can put it there.
+    struct stat status{};
+    const int failure = fileManager_.resolver().status(found.place.url().appendingFile(names::metadataFile), status);
+    return failure != 0 || S_ISREG(status.st_mode) ? failure : isNoFile;
+}
+
+bool ZORContainerCache::lookOver(const Key& key, const Found& gone) {
+    const MutexLock held(cacheLock_);
+    const auto cache = caches_.find(key);
+    if (cache == caches_.end())
+        return true; // somebody has been here meanwhile
+    auto& entries = cache->second.entries;
+    const auto known = entries.find(std::string_view(gone.record->identifier()));
+    if (known == entries.end() || known->record->place().name() != gone.place.name())
+        return true;
+    using Clock = std::chrono::steady_clock;
+    const auto begin = Clock::now();
+    auto& next = nextLookOver_[key];
+    const auto directory = configuration_.containerDirectoryURLForUser(key.userId, key.containerClass, key.transient);
+    if (begin < next || !directory)
+        return false;
+    const platform::BlockingScope blocking;
+    std::set<std::string> names;
+    ClassCache there;
+    const auto read = ClassDirectoryReader(log_, fileManager_, *directory, key.userId).forEach([&](Record record) {
+        names.insert(record->place().name());
+        record->setTransient(key.transient);
+        store(there, entryOf(std::move(record)));
+    });
+    const auto end = Clock::now();
+    next = end + std::max<Clock::duration>(lookOverPauseMin, (end - begin) * lookOverShare);
+    if (!read)
+        return false;
+    // Only of what has gone from its place: others may be in the hands of an operation.
+    for (const Entry& entry : there.entries) {
+        const auto cached = entries.find(std::string_view(entry.record->identifier()));
+        if (cached == entries.end() || names.contains(cached->record->place().name()))
+            continue;
+        log_.write(logLevelNotice, __func__, "Cache: %s%s: Identifier: %s was moved from %s to %s",
+                   className(key.containerClass), suffix(key.transient), ZOR_SHOWN(entry.record->identifier()),
+                   cached->record->url().c_str(), entry.record->url().c_str());
+        store(cache->second, entry);
+    }
+    return true;
+}
+
+Result<void> ZORContainerCache::checkOnDisk(Here here, const Key& key, const Found& found, int missing,
                                             const char* foundFormatPrefix) {
     if (found.place.empty())
         return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
                          "Cache: %s%s: nil URL from %s", className(key.containerClass), suffix(key.transient),
                          "(null)");
     const FileURL file = found.place.url().appendingFile(names::metadataFile);
-    // A link or anything else in the file's place is no metadata file: the owner of the container can put it there.
-    struct stat status{};
-    const int failure = fileManager_.resolver().status(file, status);
-    if (failure == 0 && S_ISREG(status.st_mode)) {
+    if (missing == 0) {
         traceIdentifier(here, key, foundFormatPrefix, found.record->identifier());
         return {};
     }
-    if (failure != 0 && failure != ENOENT)
+    if (missing != ENOENT && missing != isNoFile)
         log_.write(logLevelError, "itemExistsAtURL", "Failed to determine if %s exists: %s", file.c_str(),
-                   errorText(failure));
-    if (failure == ENOENT && fs::hiddenBy(fileManager_.resolver(), fileManager_.disk(), file))
+                   errorText(missing));
+    if (missing == ENOENT && fs::hiddenBy(fileManager_.resolver(), fileManager_.disk(), file))
         return failedToRebuild(here, key,
                                posixError(here, ENOKEY, "An encryption whose key is away hides %s", file.c_str()));
     std::optional<ZORError> cause;
-    if (isOwnShortage(failure))
-        cause = posixError(here, failure, "open of %s failed: %s", file.c_str(), errorText(failure));
+    if (isOwnShortage(missing))
+        cause = posixError(here, missing, "open of %s failed: %s", file.c_str(), errorText(missing));
     return makeError(log_, here, ErrorCode::cachedContainerWithoutMetadata, cause ? &*cause : nullptr, LogFlag::yes,
                      "Cache: %s%s: INCONSISTENT-No Metadata at: %s", className(key.containerClass),
                      suffix(key.transient), file.c_str());
@@ -206,12 +261,17 @@ Result<ZORContainerCache::Record> ZORContainerCache::containerForUser(std::uint3
 
 Result<ZORContainerCache::Record> ZORContainerCache::findOnDisk(Here here, const Key& key,
                                                                 const std::string& identifier) {
-    const Found found = TRY(findRecord(key, identifier));
+    Found found = TRY(findRecord(key, identifier));
     if (found.place.empty())
         return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
                          "Cache: %s%s: Invalid URL path string: %s", className(key.containerClass),
                          suffix(key.transient), "(null)");
-    TRY(checkOnDisk(here, key, found, "Found"));
+    int missing = lookForFile(found);
+    if (missing == ENOENT && lookOver(key, found)) {
+        found = TRY(findRecord(key, identifier));
+        missing = lookForFile(found);
+    }
+    TRY(checkOnDisk(here, key, found, missing, "Found"));
     return found.record;
 }
 
@@ -264,7 +324,7 @@ ZORContainerCache::thoseOnDisk(Here here, const Key& key, std::vector<Found> fou
     std::vector<Record> records;
     records.reserve(found.size());
     for (Found& one : found) {
-        const auto there = checkOnDisk(here, key, one, "ALL Found");
+        const auto there = checkOnDisk(here, key, one, lookForFile(one), "ALL Found");
         if (!there && isLeftOpen(there.error(), key))
             return there.error();
         if (there)

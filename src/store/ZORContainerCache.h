@@ -5,8 +5,9 @@
 // setup drops all of them once, before the first client. One of a user's is worth nothing when the user's home has
 // gone, come or become another one, and is built anew then. Where an encryption hides containers, those that are known
 // are found, and of no other is it said that it does not exist. The disk is the truth all the same: a lookup that
-// returns a record has just seen its metadata file. Code 21 is the one answer that means "does not exist"; every other
-// failure means "not known".
+// returns a record has just seen its metadata file. Where that has gone with its directory, the class directory is
+// looked over once for where the container may have been moved to. Code 21 is the one answer that means "does not
+// exist"; every other failure means "not known".
 //
 // One mutex guards the class caches and is held while one is built; the checks on disk run after it is released. Who
 // needs a lookup and a later add to be one step holds the identifier locks around both. Exceptions end at these
@@ -21,6 +22,7 @@
 #include "store/ZORGlobalConfiguration.h"
 #include "store/ZORMetadata.h"
 
+#include <chrono>
 #include <map>
 #include <memory>
 #include <optional>
@@ -141,8 +143,13 @@ private:
     /// Whether the error says of the container neither that it is there nor that it is not.
     [[nodiscard]] bool isLeftOpen(const ZORError& error, const Key& key) const;
     ZORError failedToRebuild(Here here, const Key& key, const ZORError& cause);
-    /// Code 44 or 47 unless the record's metadata file is there; 43 where that is hidden.
-    Result<void> checkOnDisk(Here here, const Key& key, const Found& found, const char* foundFormatPrefix);
+    /// 0 when the record's metadata file is there, an errno, or -1 when something else is there.
+    int lookForFile(const Found& found);
+    /// Reads the class directory again for what has gone from its place; false when that was not to be, yet. True means
+    /// that looking the record up again is worth while.
+    bool lookOver(const Key& key, const Found& gone) ZOR_EXCLUDES(cacheLock_);
+    /// Code 44 or 47 unless the look for the file found it; 43 where it is hidden.
+    Result<void> checkOnDisk(Here here, const Key& key, const Found& found, int missing, const char* foundFormatPrefix);
     /// Error 43 also when they were of a home that has changed since.
     Result<std::vector<Record>> thoseOnDisk(Here here, const Key& key, std::vector<Found> found,
                                             std::uint64_t homeGeneration);
@@ -161,6 +168,7 @@ private:
     std::map<Key, ClassCache> caches_ ZOR_GUARDED_BY(cacheLock_);
     /// Users of whom every class cache has been built that could be.
     std::set<std::uint32_t> wholeUsers_ ZOR_GUARDED_BY(cacheLock_);
+    std::map<Key, std::chrono::steady_clock::time_point> nextLookOver_ ZOR_GUARDED_BY(cacheLock_);
 };
 
 } // namespace zor

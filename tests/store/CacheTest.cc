@@ -4,6 +4,7 @@
 #include "support/FewDescriptors.h"
 #include "world/World.h"
 
+#include <chrono>
 #include <gtest/gtest.h>
 #include <map>
 #include <random>
@@ -146,6 +147,29 @@ TEST_F(Cache, AContainerWithoutItsFileIsInconsistent) {
         EXPECT_EQ(cache().counts().records, 2U);
     }
     ASSERT_EQ(::rename(aside.c_str(), file.c_str()), 0);
+    EXPECT_TRUE(find("a"));
+}
+
+// Goal: a container that was moved by hand is found at its new place, others' records stay as they are, and looking
+// over is bounded. Method: two moves in a row, then one after the pause.
+TEST_F(Cache, AContainerThatWasMovedByHandIsFoundAgain) {
+    put(applications, 1, "a", 11);
+    put(applications, 2, "b", 12);
+    const auto other = find("b");
+    ASSERT_TRUE(find("a") && other);
+    const auto moveTo = [&](int from, int to) {
+        ASSERT_EQ(::rename(world.path(applications + "/" + uuidNumber(from)).c_str(),
+                           world.path(applications + "/" + uuidNumber(to)).c_str()),
+                  0);
+    };
+    moveTo(1, 3);
+    const auto found = find("a");
+    ASSERT_TRUE(found);
+    EXPECT_EQ((*found)->url(), world.url(applications + "/" + uuidNumber(3)));
+    EXPECT_EQ(find("b")->get(), other->get());
+    moveTo(3, 4);
+    EXPECT_EQ(codeOf(find("a")), ErrorCode::cachedContainerWithoutMetadata);
+    std::this_thread::sleep_for(std::chrono::milliseconds(1'100));
     EXPECT_TRUE(find("a"));
 }
 
