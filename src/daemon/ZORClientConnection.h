@@ -15,6 +15,7 @@
 #include "daemon/base/UUID.h"
 #include "daemon/base/ZORLocks.h"
 #include "plist/Value.h"
+#include "store/WaitingReplaces.h"
 #include "store/ZORMetadata.h"
 
 #include <atomic>
@@ -108,8 +109,9 @@ public:
     };
     /// Takes the containers out of the store; their files go with the next deletion pass. What is not there is skipped,
     /// what is malformed is logged and skipped. With locking it runs under the all-identifiers lock held for writing;
-    /// without, the caller holds it. Errors 11 (lists that do not agree), 28 (not durable), 44 (one
-    /// could not be looked for), 46, 40.
+    /// without, the caller holds it. Only a live bundle's deletion releases what is registered for it. Errors 11 (lists
+    /// that do not agree), 28 (not durable), 35 (another may come back in one's place), 44 (one could not be looked
+    /// for), 46, 40.
     Result<void> stageForDeleteContainersWithUsers(const DeletionBatch& batch, UseLocking useLocking);
     /// Stages the one container of an identifier. Errors as the lookup's and the staging's.
     Result<void> deleteContainerForUser(std::uint32_t userId, const std::string* identifier,
@@ -129,8 +131,8 @@ public:
         PreserveOldUUID preserveOldUuid = PreserveOldUUID::no;
     };
     /// Puts the new container in the place of the old one, under the all-identifiers lock held for writing. Errors 10,
-    /// 11, 14, 15, 21 to 23, 27, 33, 34, 36, 40, 45, 46, 56. From error 15 on the old container is gone: it waits on
-    /// death row.
+    /// 11, 14, 15, 21 to 23, 27, 33 to 36, 40, 45, 46, 56. From error 15 on the old container is gone: it waits on
+    /// death row. With error 35 it waits in staging for the next request that asks for it, or the next launch.
     Result<void> replaceContainer(const ReplaceRequest& request, StartDeletionThread startDeletionThread);
     /// Undoes or finishes what a stop interrupted. At the launch, without locks. Errors 35, 36.
     Result<void> _recoverFromReplaceOperationsWithError();
@@ -234,10 +236,32 @@ private:
     Result<void> moveAwayForDelete(const FileURL& container, const FileURL& destination);
     /// False, logged, when the container stays where it is.
     bool takeAwayForDelete(const FileURL& container, std::vector<FileURL>& changed);
-    /// The standard subdirectories of the container that `changed` begins with; each is added to it.
-    Result<void> makeSubdirectories(const ContainerLayout& layout, std::vector<FileURL>& changed);
+    /// The standard subdirectories of the container that `changed` begins with; each is added to it. New ones get the
+    /// protection class.
+    Result<void> makeSubdirectories(const ContainerLayout& layout, int protectionClass, std::vector<FileURL>& changed);
+    /// Of a container that lies in its place, but whose move there could not be synced. The record says so until one
+    /// is.
+    ZORError notLasting(const char* function, ErrorCode code, const FileURL& container, const ZORError& cause);
     /// Makes what was moved into or out of these directories durable; the error is not logged.
     std::optional<ZORError> syncDirectories(std::vector<FileURL> changed);
+
+    /// A container that is about to be made, or taken from its place.
+    struct ContainerAtStake {
+        std::uint32_t userId = 0;
+        ContainerClass containerClass = ContainerClass::undefined;
+        const std::string& identifier;
+        FileURL place; // empty when it has none
+    };
+    /// Tries the replaces that wait and that could bring back a container of this identifier, or one to this place.
+    /// Whether there were any; error 35 while one is left. The caller holds the all-identifiers lock for writing.
+    Result<bool> settleReplaces(const ContainerAtStake& atStake);
+    /// Where the journals could not be listed. Error 35 while they cannot and staging may hold what is at stake.
+    Result<void> listReplacesAgain(const ContainerAtStake& atStake);
+    /// Whether what waits at `staged` may be one of this identifier, or come back to this place.
+    bool mayComeBack(const FileURL& staged, const WaitingReplaces::Waiting& waiting, const ContainerAtStake& atStake);
+    /// The cache's record, or nullptr, when no replace that waits has to do with it. Error 35.
+    Result<std::shared_ptr<ZORMetadata>> settledContainer(std::uint32_t userId, ContainerClass containerClass,
+                                                          const std::string* identifier, const UUID& uuid);
 
     Result<void> checkReplace(const ReplaceRequest& request);
     Result<void> checkedReplace(const ReplaceRequest& request, StartDeletionThread startDeletionThread);
@@ -250,7 +274,9 @@ private:
     /// What was changed in one directory is on the disk before what comes in the other can be. 0 or a negative errno.
     int orderBetween(const FileURL& changed, const FileURL& next);
     void recoverFromException(const ReplaceProgress& progress);
-    std::optional<ZORError> cleanUpReplace(const ReplaceProgress& progress, StartDeletionThread startDeletionThread);
+    /// Error 14, or 35 when the old one waits in staging.
+    ZORError undoFirstMove(ReplaceProgress& progress, const ZORError& cause);
+    std::optional<ZORError> cleanUpReplace(ReplaceProgress& progress, StartDeletionThread startDeletionThread);
     Result<void> openDirectories(ReplaceProgress& progress, const FileURL& stagingUrl);
     ZORError notInPlace(const ReplaceProgress& progress, const ZORError& cause);
     /// `journal` is nullptr for a file that is none.

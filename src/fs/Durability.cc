@@ -45,6 +45,12 @@ bool hasOrderedJournal(dev_t device) {
            !has("\njournal_async_commit\n");
 }
 
+bool onOneFileSystem(int one, int other) {
+    struct stat status{};
+    struct stat otherStatus{};
+    return ::fstat(one, &status) == 0 && ::fstat(other, &otherStatus) == 0 && status.st_dev == otherStatus.st_dev;
+}
+
 } // namespace
 
 Ordering orderingOfFileSystem(int fd) {
@@ -79,16 +85,17 @@ int Durability::beforeRemoval(int directory) const {
 }
 
 int Durability::between(int changed, int next) const {
-    struct stat changedStatus{};
-    struct stat nextStatus{};
-    const bool sameFileSystem = ::fstat(changed, &changedStatus) == 0 && ::fstat(next, &nextStatus) == 0 &&
-                                changedStatus.st_dev == nextStatus.st_dev;
     // A journal keeps the order of its own file system alone.
-    return sameFileSystem && ordering(changed) == Ordering::journal ? 0 : afterMove(changed);
+    return onOneFileSystem(changed, next) && ordering(changed) == Ordering::journal ? 0 : afterMove(changed);
 }
 
 int Durability::afterMove(int directory) const {
     return ordering(directory) == Ordering::journal ? disk_.sync(directory) : disk_.syncFileSystem(directory);
+}
+
+int Durability::afterMoves(int directory, int other) const {
+    const int synced = onOneFileSystem(directory, other) ? 0 : afterMove(other);
+    return synced < 0 ? synced : afterMove(directory);
 }
 
 } // namespace zor::fs

@@ -44,6 +44,8 @@ public:
     [[nodiscard]] int between(int changed, int next) const;
     /// After the move, before it is acknowledged; needs no lock. `directory` is where the name came to be.
     [[nodiscard]] int afterMove(int directory) const;
+    /// The same for changes of names in two directories, which may lie on two file systems.
+    [[nodiscard]] int afterMoves(int directory, int other) const;
 
 private:
     [[nodiscard]] Ordering ordering(int fd) const;

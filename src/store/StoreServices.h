@@ -13,6 +13,7 @@
 #include "platform/WorkQueue.h"
 #include "store/SetupReport.h"
 #include "store/StoreLimits.h"
+#include "store/WaitingReplaces.h"
 #include "store/ZORContainerCache.h"
 #include "store/ZORGlobalConfiguration.h"
 
@@ -51,6 +52,7 @@ struct StoreServices {
     std::shared_ptr<ZORClientConnection> sharedClientConnection;
     SetupReport setup{};
     StoreLimits limits{};
+    WaitingReplaces waitingReplaces{};
 };
 
 /// Runs `job` later on a queue; the daemon counts as busy until it has run.

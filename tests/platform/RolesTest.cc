@@ -327,7 +327,7 @@ TEST(SandboxUserState, RemovesDanglingMappings) {
     map("live", test.path("private/var/mobile/live"));
     map("gone", test.path("private/var/mobile/gone"));
     map("not.ours", "/usr");
-    map("beside", test.path("").substr(0, test.path("").size() - 1) + "x/usr");
+    map("beside", test.path("").substr(0, test.path("").size() - 1) + "private/var/mobile/live");
     const std::string directory = test.path("run/zorvane/sandbox/501/1/");
     ASSERT_EQ(::symlink("half", (directory + ".new-7").c_str()), 0);
     EXPECT_EQ(remove(), 0U);

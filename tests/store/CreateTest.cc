@@ -97,6 +97,8 @@ TEST_F(Create, EveryClassGetsItsTree) {
     EXPECT_EQ(world.item(std::string(mobileCaches) + "/Temp"), directoryOf(mobile));
 }
 
+// Goal: a well-known container lives under its name, also when a transient one has taken its place. Method: each
+// table's.
 TEST_F(Create, WellKnownContainersHaveFixedNames) {
     for (const auto& [identifier, containerClass] :
          {std::pair("com.veltra.settingsd", ContainerClass::dataSystem),
@@ -106,6 +108,21 @@ TEST_F(Create, WellKnownContainersHaveFixedNames) {
                   std::string(sharedPath) + "/" + className(containerClass) + "/" + identifier);
         world.restart();
         EXPECT_EQ(world.make(identifier, containerClass).uuid, made.uuid);
+        const FoundContainer fresh = world.make(identifier, containerClass, asTransient);
+        EXPECT_TRUE(UUID::parse(nameOf(fresh.path)));
+        EXPECT_EQ(complaintOf(world.daemonsClient().replaceContainer({.oldUuid = made.uuid,
+                                                                      .newUuid = fresh.uuid,
+                                                                      .userIdOld = ownerOf(containerClass),
+                                                                      .userIdNew = ownerOf(containerClass),
+                                                                      .identifierOld = identifier,
+                                                                      .identifierNew = identifier,
+                                                                      .classOld = containerClass,
+                                                                      .classNew = containerClass},
+                                                                     StartDeletionThread::no)),
+                  "");
+        const FoundContainer now = world.make(identifier, containerClass);
+        EXPECT_EQ(now.uuid, fresh.uuid);
+        EXPECT_EQ(now.path, made.path);
     }
     // In another class the same words are any identifier.
     EXPECT_TRUE(UUID::parse(nameOf(world.make("com.veltra.settingsd").path)));
@@ -204,9 +221,14 @@ TEST_F(Create, AShortageOfDescriptorsHidesNoContainer) {
         for (int i = 0; i < 2; ++i)
             EXPECT_EQ(world.make(identifier).uuid, made.uuid);
         {
+            world.disk().arm({.filter = [&](const DiskCallInfo& call) {
+                EXPECT_FALSE(call.call == DiskCall::unlinkFile && call.subject == names::metadataFile);
+                return false;
+            }});
             const support::FewDescriptors few(left);
             (void)world.daemonsClient().deleteContainerForUser(mobile, &identifier, application, false);
         }
+        world.disk().disarm();
         EXPECT_TRUE(!isThere(made.path) || support::readTree(made.path).describe() == before);
     }
     EXPECT_TRUE(refused);

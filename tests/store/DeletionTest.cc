@@ -100,7 +100,8 @@ TEST_F(Deletion, AMixedBatch) {
     EXPECT_FALSE(world.make("first").existed);
 }
 
-// Goal: mappings go with per-user classes, entitlements and children with bundles. Method: every class with both.
+// Goal: mappings go with per-user classes, entitlements and children with bundles, and nothing with a transient one.
+// Method: every class with both; first its transient container, then its live one.
 TEST_F(Deletion, WhatGoesWithEachClass) {
     const std::string own = "own";
     const std::string child = "child";
@@ -118,6 +119,11 @@ TEST_F(Deletion, WhatGoesWithEachClass) {
         for (const std::string& identifier : {own, std::string("other")})
             ASSERT_TRUE(world.daemonsClient()._setSandboxContainerMappingForUser(
                 mobile, identifier, perUser ? containerClass : application, world.url("private/var/mobile")));
+        const FoundContainer transient = world.make(own, containerClass, asTransient);
+        ASSERT_TRUE(stageBatch(one(transient)));
+        EXPECT_FALSE(isThere(transient.path));
+        EXPECT_EQ(mapping.entryCount(), 3U);
+        EXPECT_EQ(world.names(number == 7 ? "run/zorvane/sandbox/501/2" : "run/zorvane/sandbox/501/1").size(), 2U);
         ASSERT_TRUE(stageBatch(one(container)));
         EXPECT_FALSE(isThere(container.path));
         EXPECT_EQ(mapping.entryCount(), isBundleClass(containerClass) ? 0U : 3U);

@@ -112,6 +112,23 @@ TEST_F(Dispatch, EventsThatAreNoMessages) {
     EXPECT_FALSE(world.exists(mobileContainers));
 }
 
+// Goal: two commands give up what even the most powerful peer has: the wipe of an entitled plug-in its power over
+// others, the retry test its service on other builds. Method: a peer that may do all.
+TEST_F(Dispatch, CommandsThatDropPowers) {
+    as(grant("installer", Dictionary{{std::string(powers::allowed), true},
+                                     {std::string(powers::wipeContainer), Array{"com.plugin"}}}),
+       0);
+    for (const auto& [identifier, error] : {std::pair("com.other", 55U), std::pair("com.plugin", 1U)}) {
+        (void)makeContainer(identifier, 4);
+        EXPECT_EQ(errorOf(request({{"Command", 11}, {"UserID", 501}, {"Identifier", identifier}})), error);
+    }
+    world.log.take();
+    EXPECT_EQ(errorOf(request({{"Command", 22}, {"UserID", 501}, {"NumRetryCrashes", 0}})), 1U);
+    EXPECT_EQ(
+        world.log.take(),
+        (std::vector<LogLine>{{3, "retryTest", "People really shouldn't be calling this on non-internal installs!"}}));
+}
+
 // Goal: the reply to command 4 comes once, when the pass has run, with its code. Method: hold the queue.
 TEST_F(Dispatch, TheDeferredReplyComesOnceAfterThePass) {
     as(grant("com.example", everything));

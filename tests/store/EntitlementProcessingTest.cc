@@ -6,6 +6,7 @@
 #include "world/World.h"
 
 #include <algorithm>
+#include <future>
 #include <gtest/gtest.h>
 #include <set>
 #include <unistd.h>
@@ -65,6 +66,15 @@ protected:
 
     World world;
 };
+
+// Goal: a registration that changes anything waits for who holds all identifiers. Method: a held lock, one beside it.
+TEST_F(Processing, WaitsForAllIdentifiers) {
+    std::optional<AllIdentifiersLock> held(std::in_place, world.services().locks(), LockMode::reading);
+    auto answer = std::async(std::launch::async, [&] { return process(Dictionary{{"k", 1}}, "a"); });
+    EXPECT_EQ(answer.wait_for(std::chrono::milliseconds(50)), std::future_status::timeout);
+    held.reset();
+    EXPECT_EQ(answer.get(), ErrorCode::success);
+}
 
 // Goal: exactly the containers whose last reference goes are let go, for every user that has them.
 // Method: what "a" and "other" had and what "a" gets; each group has a container of each kind and user.

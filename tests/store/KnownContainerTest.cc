@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // What is asked of one container by its UUID: info values, its record, its structure, its directory's name, its size.
+#include "support/OpenWatch.h"
 #include "world/World.h"
 
 #include <filesystem>
@@ -64,7 +65,8 @@ TEST_F(Known, InfoValuesLastOrAreRefused) {
     EXPECT_FALSE(metadata->transient);
 }
 
-// Goal: a broken structure is whole again, and no link followed. Method: subdirectories removed, closed, swapped.
+// Goal: a broken structure is whole again, in the class that is recorded, and no link followed.
+// Method: subdirectories removed, closed, swapped; a recorded class, and a lock that takes it away.
 TEST_F(Known, StructureIsMadeAgain) {
     const FoundContainer container = world.make("com.example");
     std::filesystem::remove_all(container.path + "/Library");
@@ -72,6 +74,20 @@ TEST_F(Known, StructureIsMadeAgain) {
     ASSERT_TRUE(client().recreateDefaultStructureForUser(addressOf(container)));
     for (const char* subdirectory : {"/Documents", "/Library", "/Library/Caches", "/Library/Preferences", "/tmp"})
         EXPECT_EQ(itemAt(container.path + subdirectory), directoryOf(mobile)) << subdirectory;
+    ASSERT_TRUE(set(addressOf(container), "com.veltra.Brevance.ContentProtectionClass", 1));
+    std::filesystem::remove_all(container.path + "/tmp");
+    const auto classOf = [&](const char* subdirectory) {
+        const auto found = world.services().defaultManager().dataProtectionClassOfItemAtURL(
+            FileURL::directory(container.path + subdirectory));
+        return found.value_or(-1);
+    };
+    world.lockState.state = 1;
+    EXPECT_EQ(codeOf(client().recreateDefaultStructureForUser(addressOf(container))), ErrorCode::subdirectoryFailed);
+    EXPECT_FALSE(isThere(container.path + "/tmp"));
+    world.lockState.state = 0;
+    ASSERT_TRUE(client().recreateDefaultStructureForUser(addressOf(container)));
+    EXPECT_EQ(classOf("/tmp"), 1);
+    EXPECT_EQ(classOf("/Documents"), 3);
     world.makeDirectories("outside", 0, 0700);
     std::filesystem::remove_all(container.path + "/Library");
     std::filesystem::create_directory_symlink(world.path("outside"), container.path + "/Library");
@@ -80,10 +96,14 @@ TEST_F(Known, StructureIsMadeAgain) {
     EXPECT_TRUE(world.names("outside").empty());
 }
 
-// Goal: the directory gets another name, whole or not at all. Method: a failing rename, a rename, a restart.
+// Goal: the directory gets another name, whole or not at all, and the mapping follows the live one.
+// Method: a failing rename, a rename, a restart; before it the same of a transient one.
 TEST_F(Known, DirectoryGetsANewName) {
     const FoundContainer container = world.make("com.example");
     const Address address = addressOf(container);
+    ASSERT_TRUE(
+        client().regenerateDirectoryUUIDForUser(addressOf(world.make("com.example", application, asTransient))));
+    EXPECT_TRUE(world.names("run/zorvane/sandbox/501/1").empty());
     world.refuse(DiskCall::rename, EIO);
     EXPECT_EQ(codeOf(client().regenerateDirectoryUUIDForUser(address)), ErrorCode::directoryNotRenamed);
     world.disk().disarm();
@@ -93,31 +113,44 @@ TEST_F(Known, DirectoryGetsANewName) {
     EXPECT_NE(moved, container.path);
     EXPECT_TRUE(UUID::parse(nameOf(moved)));
     EXPECT_FALSE(isThere(container.path));
+    EXPECT_EQ(std::filesystem::read_symlink(world.path("run/zorvane/sandbox/501/1/com.example")), moved);
+    // A sync that fails says what happened.
+    world.disk().arm({.filter = [](const auto& call) {
+        return call.call == DiskCall::sync || call.call == DiskCall::syncFileSystem;
+    }});
+    const auto renamed = client().regenerateDirectoryUUIDForUser(address);
+    world.disk().disarm();
+    ASSERT_EQ(codeOf(renamed), ErrorCode::directoryNotRenamed);
+    const std::string last = client().metadataForUser(address)->path;
+    EXPECT_TRUE(renamed.error().description()->starts_with(last + " is in its place, but a power cut may undo that"));
     world.restart();
-    EXPECT_EQ(client().metadataForUser(address)->path, moved);
+    EXPECT_EQ(client().metadataForUser(address)->path, last);
 }
 
 // Goal: a bundle is measured once, data each time, rubbish over. Method: files added between queries.
 TEST_F(Known, DiskUsageIsKeptForBundlesAlone) {
     const FoundContainer bundle = world.make("com.example", ContainerClass::bundleApplication);
     const FoundContainer data = world.make("com.example");
+    const FoundContainer transient = world.make("com.example", ContainerClass::bundleApplication, asTransient);
     const auto usage = [&](const FoundContainer& container) {
         const auto answer = client().diskUsageForUserId(addressOf(container));
         EXPECT_EQ(answer.error, ErrorCode::success);
         return answer.bytes;
     };
     const auto grow = [&](const char* file) {
-        for (const FoundContainer* container : {&bundle, &data})
+        for (const FoundContainer* container : {&bundle, &data, &transient})
             world.write(world.relative(container->path) + file, std::string(100'000, 'x'));
     };
     grow("/one");
     const std::uint64_t bundleBytes = usage(bundle);
     const std::uint64_t dataBytes = usage(data);
+    const std::uint64_t transientBytes = usage(transient);
     EXPECT_GE(bundleBytes, 100'000U);
     grow("/two");
     world.restart();
     EXPECT_EQ(usage(bundle), bundleBytes);
     EXPECT_GE(usage(data), dataBytes + 100'000);
+    EXPECT_GE(usage(transient), transientBytes + 100'000); // it is being filled
     // On a disk where it cannot be kept it is said, and measured again the next time.
     for (const bool fails : {false, true}) {
         ASSERT_TRUE(set(addressOf(bundle), "com.veltra.Brevance.StaticDiskUsage", "rubbish"));
@@ -129,6 +162,27 @@ TEST_F(Known, DiskUsageIsKeptForBundlesAlone) {
     EXPECT_EQ(
         world.complaints("diskUsageForUserId"),
         std::vector<std::string>{"Error setting info value for userId: 33, identifier: com.example, Class: 1: 34"});
+}
+
+// Goal: a size is not kept for a container that moved while it was measured. Method: a renaming in the moment in which
+// the walk opens a directory.
+TEST_F(Known, ASizeIsNotKeptForWhatMovedMeanwhile) {
+    const FoundContainer bundle = world.make("com.example", ContainerClass::bundleApplication);
+    const Address address = addressOf(bundle);
+    world.write(world.relative(bundle.path) + "/a/file", "x");
+    bool moved = false;
+    const support::OpenWatch watch(bundle.path + "/a", [&] {
+        const bool first = !std::exchange(moved, true);
+        EXPECT_TRUE(!first || client().regenerateDirectoryUUIDForUser(address));
+        return true;
+    });
+    if (!watch.works())
+        GTEST_SKIP() << "skipped: needs root, and a kernel that lets an open be watched";
+    EXPECT_EQ(client().diskUsageForUserId(address).error, ErrorCode::success);
+    EXPECT_TRUE(moved);
+    EXPECT_EQ(codeOf(get(address, "com.veltra.Brevance.StaticDiskUsage")), ErrorCode::infoKeyNotFound);
+    (void)client().diskUsageForUserId(address);
+    EXPECT_TRUE(get(address, "com.veltra.Brevance.StaticDiskUsage"));
 }
 
 // Goal: the retry test ends the daemon as often as told, and leaves nothing. Method: a child a call, failing disks.

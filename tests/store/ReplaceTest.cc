@@ -30,7 +30,7 @@ const std::string destination = applications + "/33333333-3333-4333-8333-3333333
 
 class Replace : public testing::Test {
 protected:
-    Replace() {
+    explicit Replace(const World::Options& options = {}) : world(options) {
         world.log.setLevel(logLevelDebug);
         world.load();
     }
@@ -79,6 +79,14 @@ protected:
             if (!paths[i].empty())
                 content.set(keys[i], paths[i].starts_with('/') ? paths[i] : world.path(paths[i]));
         world.write(journals + "/" + journal + ".plist", binary(content));
+    }
+};
+
+class ReplaceWithoutOrder : public Replace {
+protected:
+    ReplaceWithoutOrder() : Replace({.probe = [](int) { return fs::Ordering::none; }}) {}
+    static bool isSync(const DiskCallInfo& call) {
+        return call.call == DiskCall::sync || call.call == DiskCall::syncFileSystem;
     }
 };
 
@@ -273,26 +281,46 @@ TEST_F(Replace, EveryStateOfTheTableIsRecovered) {
     }
 }
 
-// Goal: a recovery that cannot finish loses nothing and is done by a later launch. Method: a move that fails once.
+// Goal: a recovery that cannot finish loses nothing; until it can, nothing is made beside what it may bring back,
+// others are served, and the next request or launch finishes it. Method: a move that fails, requests meanwhile, then
+// either.
 TEST_F(Replace, ARecoveryThatStopsKeepsWhatItStillNeeds) {
     const std::vector<std::string> journalFile = {journal + ".plist"};
-    world.makeDirectories(applications, mobile);
-    world.write(waiting + "/content", "old");
-    world.write(staging + "/rubbish/content", "half-made");
-    putJournal({oldPlace, oldPlace + "x", waiting, oldPlace});
-    world.disk().arm({.error = EIO, .filter = [&](const DiskCallInfo& call) {
-                          return call.call == DiskCall::rename && call.subject.starts_with(journal + " -> ");
-                      }});
-    world.launch();
-    EXPECT_TRUE(world.disk().met());
-    world.disk().disarm();
-    EXPECT_EQ(world.complaints("containerManagerSetup"),
-              (std::vector<std::string>{"Failed recovering from replace operations"}));
-    EXPECT_EQ(world.names(staging), (std::vector<std::string>{journal}));
-    EXPECT_EQ(world.names(journals), journalFile);
-    relaunch();
-    EXPECT_EQ(world.read(oldPlace + "/content"), "old");
-    EXPECT_TRUE(isQuiet());
+    for (const bool byLaunch : {false, true}) {
+        SCOPED_TRACE(byLaunch);
+        world.makeDirectories(applications, mobile);
+        world.putContainer(waiting, metadataOf(2, mobile, "kept"));
+        world.write(waiting + "/content", "old");
+        world.write(staging + "/rubbish/content", "half-made");
+        putJournal({oldPlace, oldPlace + "x", waiting, oldPlace});
+        world.log.take();
+        world.disk().arm({.error = EIO, .span = FaultSpan::fromThenOn, .filter = [&](const DiskCallInfo& call) {
+                              return call.call == DiskCall::rename && call.subject.starts_with(journal + " -> ");
+                          }});
+        world.launch();
+        EXPECT_TRUE(world.disk().met());
+        EXPECT_EQ(world.complaints("containerManagerSetup"),
+                  (std::vector<std::string>{"Failed recovering from replace operations"}));
+        for (const bool transient : {false, true}) {
+            EXPECT_EQ(codeOf(world.create("kept", application, transient)), ErrorCode::journalUnusable);
+            EXPECT_EQ(codeOf(world.find("kept", application, transient)), ErrorCode::journalUnusable);
+            EXPECT_TRUE(world.create("other", application, transient));
+        }
+        EXPECT_TRUE(world.create("kept", ContainerClass::dataTempDir));
+        EXPECT_EQ(world.names(staging), (std::vector<std::string>{journal}));
+        EXPECT_EQ(world.names(journals), journalFile);
+        world.disk().disarm();
+        if (byLaunch)
+            relaunch();
+        const auto found = world.create("kept");
+        ASSERT_TRUE(found);
+        EXPECT_TRUE(found->existed);
+        EXPECT_EQ(world.read(oldPlace + "/content"), "old");
+        EXPECT_TRUE(isQuiet());
+        EXPECT_EQ(world.names(applications).size(), 2U);
+        (void)world.daemonsClient()._moveItemAtURLToDeathRow(world.url(oldPlace), StartDeletionThread::no);
+        relaunch();
+    }
     // A journal that cannot be read names nothing; while it cannot go either, it stays.
     world.write(journals + "/" + journalFile[0], "rubbish");
     world.disk().arm({.error = EIO, .span = FaultSpan::fromThenOn});
@@ -305,6 +333,71 @@ TEST_F(Replace, ARecoveryThatStopsKeepsWhatItStillNeeds) {
         }));
     EXPECT_EQ(world.names(journals), journalFile);
     world.launch();
+    EXPECT_TRUE(isQuiet());
+}
+
+// Goal: a sync that fails loses no container and brings none back; what is answered is so. Method: a file system
+// without order, on which the n-th sync of a replace fails, or all from there on; then a deletion and a launch.
+TEST_F(ReplaceWithoutOrder, ASyncThatFailsLosesNothing) {
+    const std::string identifier = "synced";
+    int undone = 0;
+    int waited = 0;
+    for (const FaultSpan span : {FaultSpan::once, FaultSpan::fromThenOn})
+        for (const Preserve preserve : {Preserve::no, Preserve::yes}) {
+            bool met = true;
+            for (std::size_t point = 1; met; ++point) {
+                SCOPED_TRACE(point);
+                const FoundContainer old = make(identifier, false);
+                const FoundContainer fresh = make(identifier, asTransient);
+                world.disk().arm({.point = point, .span = span, .filter = isSync});
+                const auto replaced = replace(swap(&old, fresh, preserve));
+                met = world.disk().met();
+                EXPECT_EQ(replaced.has_value(), !met);
+                const auto live = world.services().cache().containerForUser(mobile, application, &identifier, false);
+                ASSERT_TRUE(live);
+                const std::string content = world.read(world.relative((*live)->url().path()) + "/content");
+                EXPECT_TRUE(content == "new" || (!replaced && content == "old")) << content;
+                undone += content == "old" ? 1 : 0;
+                const auto deletion = [&] {
+                    return codeOf(world.daemonsClient().stageForDeleteContainersWithUsers(
+                        ZORClientConnection::DeletionBatch::of(mobile, (*live)->uuid(), identifier, application),
+                        UseLocking::yes));
+                };
+                const ErrorCode deleted = deletion();
+                EXPECT_EQ(isThere((*live)->url().path()), deleted == ErrorCode::journalUnusable);
+                world.disk().disarm();
+                if (deleted == ErrorCode::journalUnusable) {
+                    ++waited;
+                    EXPECT_EQ(deletion(), ErrorCode::success);
+                }
+                relaunch();
+                EXPECT_FALSE(world.find(identifier));
+                EXPECT_TRUE(isQuiet());
+            }
+        }
+    EXPECT_GT(undone, 2);
+    EXPECT_GT(waited, 0);
+}
+
+// Goal: an old one that cannot be moved back is not lost, and nothing is made beside it. Method: the sync behind its
+// move and the move back fail.
+TEST_F(ReplaceWithoutOrder, AnOldOneThatCannotGoBackWaits) {
+    const FoundContainer old = make("waits", false);
+    const FoundContainer fresh = make("waits", asTransient);
+    bool away = false;
+    world.disk().arm({.span = FaultSpan::fromThenOn, .filter = [&](const DiskCallInfo& call) {
+                          away = away || call.subject.starts_with(nameOf(old.path) + " -> ");
+                          return away && (isSync(call) || call.subject.ends_with(" -> " + nameOf(old.path)));
+                      }});
+    EXPECT_EQ(codeOf(replace(swap(&old, fresh))), ErrorCode::journalUnusable);
+    EXPECT_EQ(codeOf(world.create("waits")), ErrorCode::journalUnusable);
+    EXPECT_EQ(codeOf(replace(swap(nullptr, fresh))), ErrorCode::journalUnusable);
+    world.disk().disarm();
+    const auto found = world.create("waits");
+    ASSERT_TRUE(found);
+    EXPECT_EQ(found->uuid, old.uuid);
+    EXPECT_EQ(contentOf(*found), "old");
+    EXPECT_EQ(contentOf(fresh), "new");
     EXPECT_TRUE(isQuiet());
 }
 

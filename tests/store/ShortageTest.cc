@@ -42,7 +42,8 @@ protected:
 };
 
 // Goal: a launch that cannot read the journals deletes nothing that they name. Method: a stopped replace, a launch with
-// few descriptors or something else in the journals' place, then a launch as it should be.
+// few descriptors or something else in the journals' place; then a request for the old one, and a launch as it should
+// be.
 TEST_F(Shortage, JournalsThatCannotBeReadKeepWhatTheyName) {
     const FoundContainer old = world.make("old");
     const std::string content = world.relative(old.path) + "/content";
@@ -55,6 +56,8 @@ TEST_F(Shortage, JournalsThatCannotBeReadKeepWhatTheyName) {
             std::filesystem::rename(there, there + ".aside");
             world.write(journals, "no directory");
             relaunch();
+            EXPECT_EQ(codeOf(world.create("old")), ErrorCode::journalUnusable);
+            EXPECT_TRUE(world.create("another"));
             std::filesystem::remove(there);
             std::filesystem::rename(there + ".aside", there);
         } else {
@@ -63,8 +66,40 @@ TEST_F(Shortage, JournalsThatCannotBeReadKeepWhatTheyName) {
             const support::FewDescriptors few(left);
             world.daemonsClient().containerManagerSetup();
         }
+        const FoundContainer found = world.make("old");
+        EXPECT_EQ(found.uuid, old.uuid);
+        EXPECT_EQ(found.path, old.path);
         relaunch();
         ASSERT_EQ(world.read(content), "old");
+    }
+}
+
+// Goal: a shortage of moments loses, doubles and keeps nothing of what it met. Method: a launch that finds a stopped
+// replace, requests and a deletion, while the limit of descriptors comes and goes.
+TEST_F(Shortage, ALimitThatComesAndGoes) {
+    const FoundContainer old = world.make("old");
+    const std::string content = world.relative(old.path) + "/content";
+    world.write(content, "old");
+    const std::string victim = "victim";
+    for (int round = 0; round < 150; ++round) {
+        SCOPED_TRACE(round);
+        (void)world.make(victim);
+        stopAReplaceOf(old);
+        world.restart();
+        world.load();
+        {
+            const support::DescriptorsThatComeAndGo limit;
+            world.daemonsClient().containerManagerSetup();
+            const auto found = world.create("old");
+            EXPECT_TRUE(!found || found->uuid == old.uuid);
+            (void)world.daemonsClient().deleteContainerForUser(mobile, &victim, application, false);
+        }
+        EXPECT_EQ(world.make("old").uuid, old.uuid);
+        const FoundContainer either = world.make(victim); // gone, or whole
+        EXPECT_TRUE(isThere(either.path + "/Library/Preferences"));
+        relaunch();
+        ASSERT_EQ(world.read(content), "old");
+        ASSERT_EQ(world.names(applications).size(), 2U);
     }
 }
 
@@ -74,7 +109,7 @@ TEST_F(Shortage, ASizeMeasuredInPartIsNotKept) {
     for (rlim_t left = 0; left < descriptorsMax; ++left) {
         SCOPED_TRACE(left);
         const FoundContainer bundle = world.make("size" + std::to_string(left), ContainerClass::bundleApplication);
-        world.write(world.relative(bundle.path) + "/a/b/file", std::string(100'000, 'x'));
+        world.write(world.relative(bundle.path) + "/a/b/c/d/e/f/g/h/i/j/k/l/file", std::string(100'000, 'x'));
         const ZORClientConnection::ContainerAddress address{.userId = bundle.record->uid(),
                                                             .uuid = bundle.uuid,
                                                             .identifier = bundle.record->identifier(),

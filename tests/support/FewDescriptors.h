@@ -2,8 +2,10 @@
 // A process that runs short of descriptors for a while.
 #pragma once
 
+#include <chrono>
 #include <fcntl.h>
 #include <sys/resource.h>
+#include <thread>
 #include <unistd.h>
 
 namespace zor::support {
@@ -24,6 +26,24 @@ public:
 
 private:
     rlimit before_{};
+};
+
+/// The same limit, there for a moment and gone for a moment, over and over, wherever the process is by then.
+class DescriptorsThatComeAndGo {
+public:
+    DescriptorsThatComeAndGo()
+        : changing_([](const std::stop_token& stop) {
+              for (rlim_t round = 0; !stop.stop_requested(); ++round) {
+                  {
+                      const FewDescriptors few(round % 4);
+                      std::this_thread::sleep_for(std::chrono::microseconds(20));
+                  }
+                  std::this_thread::sleep_for(std::chrono::microseconds(60));
+              }
+          }) {}
+
+private:
+    std::jthread changing_;
 };
 
 } // namespace zor::support

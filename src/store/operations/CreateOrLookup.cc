@@ -85,6 +85,12 @@ Result<FoundContainer> ZORClientConnection::createOrLookup(std::uint32_t userId,
         if (homeGeneration != before)
             record = services_.cache.containerForUser(userId, containerClass, &identifier, options.transient);
     }
+    if (record ? options.transient : record.error().is(ErrorCode::notFound)) {
+        const bool settled =
+            TRY(settleReplaces({.userId = userId, .containerClass = containerClass, .identifier = identifier}));
+        if (settled)
+            record = services_.cache.containerForUser(userId, containerClass, &identifier, options.transient);
+    }
     if (record && !options.transient) {
         (*record)->setExisted(true);
         return snapshot(*record);
@@ -147,7 +153,9 @@ Result<FoundContainer> ZORClientConnection::create(std::uint32_t userId, const s
         }();
         if (!built)
             return cleanUpStaging(staging, std::move(built).error());
-        const std::string* wellKnown = services_.whitelist.wellknownContainerForId(identifier, containerClass);
+        // The fixed name is the live one's; a transient one has a name with which it can take its place.
+        const std::string* wellKnown =
+            transient ? nullptr : services_.whitelist.wellknownContainerForId(identifier, containerClass);
         const auto moved = [&]() -> Result<void> {
             const auto classDirectory = services_.configuration.openClassDirectory(userId, containerClass, transient);
             // What was looked for in one home is not made in another.
@@ -202,10 +210,16 @@ Result<void> ZORClientConnection::makeDurable(const FoundContainer& container) {
         container.record->setDurable(true);
         return {};
     }
-    const ZORError cause = posixError(ZOR_HERE, -status, "sync of %s failed: %s",
-                                      live.deletingLastPathComponent().c_str(), errorText(-status));
-    return makeError(services_.log, {"createOrLookupContainerForUser", __LINE__}, ErrorCode::moveToLiveFailed, &cause,
-                     LogFlag::yes, "Failed to move staging dir: %s to live dir: %s", live.c_str(), live.c_str());
+    return notLasting("createOrLookupContainerForUser", ErrorCode::moveToLiveFailed, live,
+                      posixError(ZOR_HERE, -status, "sync of %s failed: %s", live.deletingLastPathComponent().c_str(),
+                                 errorText(-status)));
+}
+
+ZORError ZORClientConnection::notLasting(const char* function, ErrorCode code, const FileURL& container,
+                                         const ZORError& cause) {
+    return makeError(services_.log, {function, __LINE__}, code, &cause, LogFlag::yes,
+                     "%s is in its place, but a power cut may undo that (%s); ask for it again", container.c_str(),
+                     cause.text().c_str());
 }
 
 } // namespace zor

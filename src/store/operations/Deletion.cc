@@ -59,8 +59,8 @@ Result<void> ZORClientConnection::stageForDeleteContainersWithUsers(const Deleti
             Result<void> first;
             for (std::size_t index = 0; index < count; ++index) {
                 auto one = stageForDelete(batch, index, changed);
-                // What could not be looked for keeps no other from going.
-                if (!one && !one.error().isOwnShortage())
+                // What could not be looked for, or has to stay, keeps no other from going.
+                if (!one && !one.error().isOwnShortage() && !one.error().is(ErrorCode::journalUnusable))
                     return one;
                 if (!one && first)
                     first = std::move(one);
@@ -93,17 +93,19 @@ Result<void> ZORClientConnection::stageForDelete(const DeletionBatch& batch, std
                   uuid ? uuid->string().c_str() : "(null)", ZOR_SHOWN(identifier), static_cast<long>(containerClass));
         return {};
     }
-    const auto record = TRY(services_.cache.containerForUser(userId, containerClass, &*identifier, uuid->string()));
+    // Where another waits to come back, the place of this one is not made free for it.
+    const auto record = TRY(settledContainer(userId, containerClass, &*identifier, *uuid));
     if (!record)
         return {};
-    if (isBundleClass(containerClass))
+    // What a transient one is for may not come to be: what is registered is still the live one's.
+    const bool transient = record->transient();
+    if (isBundleClass(containerClass) && !transient)
         services_.entitlements.removeEntitlementDictionariesForIdentifierAndItsChildren(*identifier);
     if (!takeAwayForDelete(record->url(), changed))
         return {};
-    if (isPerUserClass(containerClass) &&
+    if (isPerUserClass(containerClass) && !transient &&
         !_setSandboxContainerMappingForUser(userId, *identifier, containerClass, std::nullopt))
         services_.log.write(logLevelError, stageFunction, "Failed to remove container mapping in delete operation");
-    const bool transient = record->transient();
     const auto removed =
         services_.cache.removeContainerForUser(userId, record->containerClass(), &record->identifier(), transient);
     if (!removed)

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// How many bytes a container takes. What a bundle takes is measured once and kept with its info, since its content does
-// not change; everything else is measured each time.
+// How many bytes a container takes. What a live bundle takes is measured once and kept with its info, since its content
+// does not change; everything else is measured each time. A transient bundle is being filled.
 //
 // The walk holds no lock: a lookup waits for every identifier lock, so a large container would stop all clients for as
 // long as it is walked. The container is looked up and opened under its lock, and walked on that descriptor; the result
@@ -47,7 +47,7 @@ void ZORClientConnection::keepDiskUsage(const ContainerAddress& address, const F
     const IdentifierLock lock(services_.locks, address.uuid->string(), LockMode::writing);
     const auto record = services_.cache.containerForUser(address.userId, address.containerClass, &*address.identifier,
                                                          address.uuid->string());
-    if (!record || !*record || (*record)->url() != measured)
+    if (!record || !*record || (*record)->transient() || (*record)->url() != measured)
         return;
     const plist::Value value(bytes);
     const auto kept = setInfoValue(&value, &staticDiskUsageKey, address, UseLocking::no);
@@ -60,13 +60,14 @@ void ZORClientConnection::keepDiskUsage(const ContainerAddress& address, const F
 
 Result<std::uint64_t> ZORClientConnection::diskUsage(const ContainerAddress& address) {
     TRY(checkAddress(function, address));
-    const bool isBundle = isBundleClass(address.containerClass);
+    bool isKept = false;
     FileURL container;
     fs::OpenResult directory = std::unexpected(ENOENT);
     {
         const IdentifierLock lock(services_.locks, address.uuid->string(), LockMode::writing);
         const auto record = TRY(knownContainer(function, address));
-        if (isBundle)
+        isKept = isBundleClass(address.containerClass) && !record->transient();
+        if (isKept)
             if (const auto kept = keptDiskUsage(address))
                 return *kept;
         container = record->url();
@@ -81,7 +82,7 @@ Result<std::uint64_t> ZORClientConnection::diskUsage(const ContainerAddress& add
         const platform::BlockingScope blocking; // a large tree must not take one of the few threads from all clients
         return services_.fileManager.diskUsageOfDirectory(directory, container);
     }();
-    if (isBundle && !usage.cutShort)
+    if (isKept && !usage.cutShort)
         keepDiskUsage(address, container, usage.bytes);
     return usage.bytes;
 }

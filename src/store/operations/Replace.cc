@@ -13,9 +13,14 @@
 // the file system does not see to that, syncs do), and they are on the disk before the journal goes and the client
 // hears.
 //
+// A sync that fails behind the first move undoes it; one that fails behind the second leaves the journal, and what
+// waits in staging, to `SettleReplaces.cc`: from there the old one never goes to death row before the moves are on the
+// disk.
+//
 // A replace whose second move fails has lost the old container, which went to death row. So everything that can be
 // looked at beforehand is: both directories can be opened, the destination is free.
 #include "daemon/ZORClientConnection.h"
+#include "entitlements/ZORWhitelist.h"
 #include "platform/BlockingScope.h"
 #include "store/StoreServices.h"
 #include "store/operations/ReplaceJournal.h"
@@ -40,6 +45,9 @@ struct ZORClientConnection::ReplaceProgress {
     FileURL stagingUrl;                // empty until it is known
     FileURL journalUrl;                // the same
     std::optional<UUID> newUuidBefore; // while the new container's file says the old UUID
+    /// The directory of which a move is to be on the disk before the journal can be gone; nullptr: none.
+    const FileDescriptor* moved = nullptr;
+    bool oldWaits = false; // in staging, and its journal with it, for a later try
     /// Opened before the first move, so that want of descriptors stops no replace half-way and leaves no journal of one
     /// that is done: a launch would take it for one to be undone as soon as the new container has gone.
     struct {
@@ -95,9 +103,15 @@ Result<void> ZORClientConnection::checkedReplace(const ReplaceRequest& request,
     if (!swapped)
         return swapped;
     const platform::BlockingScope blocking;
-    if (const int synced = services_.durability.afterMove(progress.directories.dest.get()); synced < 0)
-        return notInPlace(progress, posixError({replaceFunction, __LINE__}, -synced, "sync of %s failed: %s",
-                                               progress.destUrl.c_str(), errorText(-synced)));
+    const auto& directories = progress.directories;
+    const int dest = directories.dest.get();
+    // A journal that came back with the power would undo what comes to the new one later.
+    const int synced = services_.durability.afterMoves(dest, progress.oldRecord ? directories.journals.get() : dest);
+    if (synced < 0)
+        return notLasting(replaceFunction, ErrorCode::newNotMovedIntoPlace, progress.destUrl,
+                          posixError({replaceFunction, __LINE__}, -synced, "sync of %s failed: %s",
+                                     progress.destUrl.c_str(), errorText(-synced)));
+    progress.newRecord->setDurable(true);
     return {};
 }
 
@@ -149,8 +163,7 @@ Result<void> ZORClientConnection::prepareReplace(const ReplaceRequest& request, 
     const auto known = [&](std::uint32_t userId, const std::optional<UUID>& uuid,
                            const std::optional<std::string>& identifier,
                            ContainerClass containerClass) -> Result<std::shared_ptr<ZORMetadata>> {
-        auto record =
-            TRY(services_.cache.containerForUser(userId, containerClass, pointerTo(identifier), uuid->string()));
+        auto record = TRY(settledContainer(userId, containerClass, pointerTo(identifier), *uuid));
         if (!record)
             return makeError(log, here, ErrorCode::notFound, nullptr, LogFlag::yes,
                              "No Container with userId: %u UUID: %s, identifier: %s, Class: %ld", userId,
@@ -176,9 +189,15 @@ Result<void> ZORClientConnection::prepareReplace(const ReplaceRequest& request, 
     } else {
         const auto classDirectory = services_.configuration.containerDirectoryURLForUser(
             request.userIdNew, request.classNew, progress.oldWasTransient);
+        // A well-known container lives under its name, whichever it is.
+        const std::string* wellKnown =
+            progress.oldWasTransient
+                ? nullptr
+                : services_.whitelist.wellknownContainerForId(progress.newRecord->identifier(), request.classNew);
         if (classDirectory)
-            progress.destUrl = classDirectory->appendingDirectory(directoryUuid->string());
-        if (!classDirectory || !services_.fileManager.itemDoesNotExistAtURL(progress.destUrl))
+            progress.destUrl = classDirectory->appendingDirectory(wellKnown ? *wellKnown : directoryUuid->string());
+        if (!classDirectory ||
+            (progress.destUrl != progress.oldUrl && !services_.fileManager.itemDoesNotExistAtURL(progress.destUrl)))
             return makeError(log, here, ErrorCode::alreadyExists, nullptr, LogFlag::yes,
                              "Container already exists at %s", progress.destUrl.c_str());
     }
@@ -224,17 +243,22 @@ Result<void> ZORClientConnection::moveOldAway(const ReplaceRequest& request, Rep
         progress.newRecord->setUuid(progress.oldRecord->uuid());
         TRY(progress.newRecord->writeMetadataToDiskWithError(log, services_.fileManager));
     }
-    progress.journalUrl = ReplaceJournal::urlFor(services_.configuration.replaceDirectory(), journalUuid);
+    const FileURL journalUrl = ReplaceJournal::urlFor(services_.configuration.replaceDirectory(), journalUuid);
     progress.stagingUrl = stagingUrl;
     const ReplaceJournal journal{.oldUrl = progress.oldUrl,
                                  .newUrl = progress.newUrl,
                                  .stagingUrl = progress.stagingUrl,
                                  .destUrl = progress.destUrl};
-    if (auto written = journal._writeToDiskReplaceAt(log, services_.fileManager, progress.journalUrl); !written) {
+    const auto& directories = progress.directories;
+    if (auto written = journal._writeToDiskReplaceAt(log, services_.fileManager, journalUrl); !written) {
         log.write(logLevelError, replaceFunction, "Failed to write replace file: %s", written.error().text().c_str());
+        // Where only its last sync failed it is there; nothing has moved, so it does no harm where it stays.
+        const std::string name(journalUrl.lastPathComponent());
+        (void)services_.fileManager.disk().unlinkFile(directories.journals.get(), name.c_str());
         return written;
     }
-    const auto& directories = progress.directories;
+    progress.journalUrl = journalUrl;
+    progress.moved = &directories.old;
     const auto moved = services_.fileManager.moveItem(directories.old.get(), progress.oldUrl, directories.staging.get(),
                                                       progress.stagingUrl);
     if (!moved)
@@ -242,6 +266,12 @@ Result<void> ZORClientConnection::moveOldAway(const ReplaceRequest& request, Rep
     // A copy does not fail when only the source cannot go: two would be live.
     if (*moved == ZORFileManager::Moved::byCopy && !services_.fileManager.itemDoesNotExistAtURL(progress.oldUrl))
         return oldNotMoved(posixError(here, EBUSY, "%s is still there", progress.oldUrl.c_str()));
+    progress.moved = &directories.dest;
+    // Where nothing else keeps the order of two moves, a cut could leave the second one without the first.
+    if (const int ordered = services_.durability.between(directories.staging.get(), directories.dest.get());
+        ordered < 0)
+        return undoFirstMove(
+            progress, posixError(here, -ordered, "sync of %s failed: %s", stagingUrl.c_str(), errorText(-ordered)));
     const bool transient = progress.oldWasTransient;
     const auto removed = services_.cache.removeContainerForUser(request.userIdOld, request.classOld,
                                                                 &progress.oldRecord->identifier(), transient);
@@ -249,12 +279,25 @@ Result<void> ZORClientConnection::moveOldAway(const ReplaceRequest& request, Rep
         return makeError(log, here, ErrorCode::cacheRemoveFailed, &removed.error(), LogFlag::yes,
                          "Failed to remove from cache id: %s, class: %ld, transient: %d",
                          ZOR_SHOWN(progress.oldRecord->identifier()), static_cast<long>(request.classOld), transient);
-    // Where nothing else keeps the order of two moves, a cut could leave the second one without the first.
-    const int ordered = services_.durability.between(directories.staging.get(), directories.dest.get());
-    if (ordered < 0)
-        return oldNotMoved(
-            posixError(here, -ordered, "sync of %s failed: %s", progress.stagingUrl.c_str(), errorText(-ordered)));
     return {};
+}
+
+ZORError ZORClientConnection::undoFirstMove(ReplaceProgress& progress, const ZORError& cause) {
+    const Log& log = services_.log;
+    const Here here{replaceFunction, __LINE__};
+    const auto& directories = progress.directories;
+    const auto undone = services_.fileManager.moveItem(directories.staging.get(), progress.stagingUrl,
+                                                       directories.old.get(), progress.oldUrl);
+    if (undone) {
+        progress.moved = &directories.old;
+        return makeError(log, here, ErrorCode::oldNotMovedToStaging, &cause, LogFlag::yes,
+                         "Failed to move old %s to staging %s", progress.oldUrl.c_str(), progress.stagingUrl.c_str());
+    }
+    progress.oldWaits = true;
+    (void)services_.cache.removeContainerForUser(progress.oldRecord->uid(), progress.oldRecord->containerClass(),
+                                                 &progress.oldRecord->identifier(), progress.oldWasTransient);
+    return makeError(log, here, ErrorCode::journalUnusable, &undone.error(), LogFlag::yes,
+                     "Failed to recover replace move: %s to %s", progress.stagingUrl.c_str(), progress.oldUrl.c_str());
 }
 
 Result<void> ZORClientConnection::openDirectories(ReplaceProgress& progress, const FileURL& stagingUrl) {
@@ -288,6 +331,7 @@ Result<void> ZORClientConnection::putNewInPlace(const ReplaceRequest& request, R
     if (!moved)
         return notInPlace(progress, moved.error());
     progress.newUuidBefore.reset(); // the old UUID is its own from now on
+    record.setDurable(false);
     const bool newWasTransient = record.transient();
     const auto removed = services_.cache.removeContainerForUser(request.userIdNew, request.classNew,
                                                                 &record.identifier(), newWasTransient);
@@ -296,13 +340,16 @@ Result<void> ZORClientConnection::putNewInPlace(const ReplaceRequest& request, R
                          "Failed to remove from cache id: %s, class: %ld, transient: %d",
                          ZOR_SHOWN(record.identifier()), static_cast<long>(request.classNew), newWasTransient);
     if (isPerUserClass(request.classNew)) {
+        // Mappings are of live ones alone.
+        const bool becomesLive = !progress.oldWasTransient;
         const bool otherIdentifier =
-            progress.oldRecord && progress.oldRecord->identifier() != record.identifier() && !progress.oldWasTransient;
+            progress.oldRecord && progress.oldRecord->identifier() != record.identifier() && becomesLive;
         if (otherIdentifier)
             (void)_setSandboxContainerMappingForUser(request.userIdOld, progress.oldRecord->identifier(),
                                                      request.classOld, std::nullopt);
-        if (!_setSandboxContainerMappingForUser(request.userIdNew, record.identifier(), request.classNew,
-                                                progress.destUrl))
+        if ((becomesLive || !newWasTransient) &&
+            !_setSandboxContainerMappingForUser(request.userIdNew, record.identifier(), request.classNew,
+                                                becomesLive ? std::optional(progress.destUrl) : std::nullopt))
             log.write(logLevelError, replaceFunction, "Failed to set container mapping in replace operation");
     }
     record.setTransient(progress.oldWasTransient);
@@ -345,9 +392,8 @@ void ZORClientConnection::recoverFromException(const ReplaceProgress& progress) 
     std::abort();
 }
 
-std::optional<ZORError> ZORClientConnection::cleanUpReplace(const ReplaceProgress& progress,
+std::optional<ZORError> ZORClientConnection::cleanUpReplace(ReplaceProgress& progress,
                                                             StartDeletionThread startDeletionThread) {
-    std::optional<ZORError> failed;
     if (progress.newUuidBefore) {
         // It did not take the old one's place: it is again who it was. Should that fail, the file's next writing does
         // it.
@@ -355,26 +401,36 @@ std::optional<ZORError> ZORClientConnection::cleanUpReplace(const ReplaceProgres
         (void)progress.newRecord->writeMetadataToDiskWithError(services_.log, services_.fileManager);
     }
     if (!progress.oldRecord || progress.journalUrl.empty())
-        return failed;
-    // The moves are on the disk before the journal can be gone. Where that cannot be, it stays for the next launch,
-    // which finds what has moved.
+        return std::nullopt;
     const auto& directories = progress.directories;
-    const FileURL place = progress.destUrl.deletingLastPathComponent();
-    if (const int ordered = services_.durability.between(directories.dest.get(), directories.journals.get());
-        ordered < 0) {
-        const ZORError cause = posixError({replaceFunction, __LINE__}, -ordered, "sync of %s failed: %s", place.c_str(),
-                                          errorText(-ordered));
+    const auto waits = [&] {
+        services_.waitingReplaces.add(
+            {.journalUrl = progress.journalUrl, .oldUrl = progress.oldUrl, .destUrl = progress.destUrl});
+    };
+    const auto journalStays = [&](const ZORError& cause) {
+        waits();
         return makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &cause,
                          LogFlag::yes, "Failed to remove replace file: %s", progress.journalUrl.c_str());
+    };
+    if (progress.oldWaits) {
+        waits();
+        return std::nullopt;
     }
+    // The moves are on the disk before the journal can be gone. Where that cannot be, it stays for the next request or
+    // launch, which finds what has moved.
+    const int ordered =
+        progress.moved ? services_.durability.between(progress.moved->get(), directories.journals.get()) : 0;
+    if (ordered < 0)
+        return journalStays(posixError({replaceFunction, __LINE__}, -ordered, "sync of %s failed: %s",
+                                       progress.destUrl.deletingLastPathComponent().c_str(), errorText(-ordered)));
+    std::optional<ZORError> failed;
     if (const auto moved = _moveItemAtURLToDeathRow(progress.stagingUrl, StartDeletionThread::no); !moved)
         failed = makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
                            LogFlag::yes, "Failed to remove staging dir: %s", progress.stagingUrl.c_str());
     const std::string journalName(progress.journalUrl.lastPathComponent());
     if (const auto moved = _moveItemAtURLToDeathRow(progress.journalUrl, startDeletionThread);
         !moved && services_.fileManager.disk().unlinkFile(directories.journals.get(), journalName.c_str()) < 0)
-        failed = makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
-                           LogFlag::yes, "Failed to remove replace file: %s", progress.journalUrl.c_str());
+        failed = journalStays(moved.error());
     return failed;
 }
 

@@ -4,6 +4,7 @@
 #include "fs/DictionaryFile.h"
 
 #include <array>
+#include <cerrno>
 
 namespace zor {
 
@@ -72,6 +73,11 @@ Result<ReplaceJournal> ReplaceJournal::_readAndValidateReplaceFileAtUrl(const Lo
         urls[i] = FileURL::directory(*path);
     }
     return ReplaceJournal{.oldUrl = urls[0], .newUrl = urls[1], .stagingUrl = urls[2], .destUrl = urls[3]};
+}
+
+bool ReplaceJournal::mayStillBeRead(const ZORError& readFailure) {
+    const ZORError* const cause = readFailure.underlying();
+    return cause && (cause->isOwnShortage() || cause->isPosix(EIO));
 }
 
 void ReplaceJournal::moveToRoot(const std::string& rootPath, const FileURL& stagingDirectory) {

@@ -29,6 +29,9 @@ struct ReplaceJournal {
     /// Error 35, logged, for a file that cannot be read or lacks a path.
     [[nodiscard]] static Result<ReplaceJournal>
     _readAndValidateReplaceFileAtUrl(const Log& log, ZORFileManager& fileManager, const FileURL& url);
+    /// Whether such a failed reading says nothing of the content: the file may be a good journal, and another time may
+    /// tell.
+    [[nodiscard]] static bool mayStillBeRead(const ZORError& readFailure);
     /// The paths are absolute. Where the whole root was moved since the journal was written, they are made to lie below
     /// it again: its old place is what precedes the staging directory's own path in `stagingUrl`.
     void moveToRoot(const std::string& rootPath, const FileURL& stagingDirectory);

@@ -6,7 +6,10 @@
 // which the ended daemon made and had not synced, is on the disk before the journal can be gone: a stop in between
 // leaves another row of the table.
 //
-// Runs on the thread that starts the daemon, before any client and before anything is cached.
+// A journal that cannot be settled or read stays and waits (`SettleReplaces.cc`).
+//
+// At a launch it runs on the thread that starts the daemon, before any client and before anything is cached; later
+// under the all-identifiers lock, for one journal.
 #include "daemon/ZORClientConnection.h"
 #include "store/StoreServices.h"
 #include "store/operations/ReplaceJournal.h"
@@ -70,12 +73,6 @@ Found look(ZORFileManager& fileManager, const FileURL& url) {
     return fileManager.itemDoesNotExistAtURL(url) ? Found::absent : Found::unknown;
 }
 
-/// A journal that could not be read may be a good one: it waits for a launch that can read it.
-bool saysNothingOfContent(const ZORError& readFailure) {
-    const ZORError* const cause = readFailure.underlying();
-    return cause && (cause->isOwnShortage() || cause->isPosix(EIO));
-}
-
 /// nullptr when what matters cannot be examined.
 const State* stateOf(ZORFileManager& fileManager, const ReplaceJournal& journal) {
     const Found destination = look(fileManager, journal.destUrl);
@@ -96,20 +93,32 @@ Result<void> ZORClientConnection::_recoverFromReplaceOperationsWithError() {
         if (!items.error().isPosix(ENOENT))
             services_.log.write(logLevelError, recoverFunction, "Failed to get items at replace URL%s : %s",
                                 replace.c_str(), items.error().text().c_str());
+        services_.waitingReplaces.setUnlisted(!items.error().isPosix(ENOENT));
         return {};
     }
+    services_.waitingReplaces.setUnlisted(false);
     // A journal has its name for itself alone, so no later write removes what a stop left of this one's.
     for (const FileURL& leftover : services_.fileManager.writeLeftoversInDirectoryAtURL(replace))
         (void)_moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
     std::optional<ZORError> unread;
+    std::optional<ZORError> stopped;
     for (const FileURL& item : *items) {
         auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(services_.log, services_.fileManager, item);
         // It stays, with what it names in staging; the others do not hang on it.
-        if (!journal && saysNothingOfContent(journal.error()))
-            unread = std::move(journal).error();
-        else
-            TRY(recoverReplace(item, journal ? &*journal : nullptr));
+        const bool unreadable = !journal && ReplaceJournal::mayStillBeRead(journal.error());
+        if (unreadable)
+            unread = journal.error();
+        else if (!stopped)
+            if (auto recovered = recoverReplace(item, journal ? &*journal : nullptr); !recovered)
+                stopped = std::move(recovered).error();
+        // Found again by the next launch; until then whoever asks for what it names tries.
+        if (unreadable || stopped)
+            services_.waitingReplaces.add({.journalUrl = item,
+                                           .oldUrl = journal ? journal->oldUrl : FileURL(),
+                                           .destUrl = journal ? journal->destUrl : FileURL()});
     }
+    if (stopped)
+        return std::move(*stopped);
     return unread ? Result<void>(std::move(*unread)) : Result<void>();
 }
 
@@ -126,6 +135,7 @@ Result<void> ZORClientConnection::recoverReplace(const FileURL& journalUrl, Repl
     if (const auto moved = _moveItemAtURLToDeathRow(journalUrl, StartDeletionThread::no); !moved)
         return makeError(log, {recoverFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
                          LogFlag::yes, "Failed to remove replace file at %s", journalUrl.c_str());
+    services_.waitingReplaces.remove(journalUrl);
     return {};
 }
 

@@ -2,6 +2,9 @@
 // Two repairs of a container: its standard subdirectories made again, and a new name for its directory. Neither gives a
 // directory away because it has a wanted name: the container and each subdirectory are judged on the descriptor used.
 //
+// A subdirectory that is made anew has the protection class that is recorded for the container; while the device is
+// locked, one that lock takes away cannot be given, and the repair fails.
+//
 // A stop leaves some subdirectories made, one perhaps not yet its owner's, until the repair is repeated; or the
 // container under its old or its new name; a mapping that then points to nothing is removed at the next launch.
 #include "daemon/ZORClientConnection.h"
@@ -25,7 +28,8 @@ Result<void> ZORClientConnection::recreateDefaultStructureForUser(const Containe
             const IdentifierLock lock(services_.locks, address.uuid->string(), LockMode::writing);
             const auto record = TRY(knownContainer(function, address));
             changed.push_back(record->url());
-            TRY(makeSubdirectories(layoutOf(address.containerClass, address.userId), changed));
+            TRY(makeSubdirectories(layoutOf(address.containerClass, address.userId),
+                                   record->recordedProtectionClass().value_or(protectionClassUnchanged), changed));
         }
         if (const auto failed = syncDirectories(changed))
             return makeError(services_.log, {function, __LINE__}, ErrorCode::subdirectoryFailed, &*failed, LogFlag::yes,
@@ -34,7 +38,8 @@ Result<void> ZORClientConnection::recreateDefaultStructureForUser(const Containe
     });
 }
 
-Result<void> ZORClientConnection::makeSubdirectories(const ContainerLayout& layout, std::vector<FileURL>& changed) {
+Result<void> ZORClientConnection::makeSubdirectories(const ContainerLayout& layout, int protectionClass,
+                                                     std::vector<FileURL>& changed) {
     const FileURL container = changed.front();
     ZORFileManager& fileManager = services_.fileManager;
     // Each is reached from the one that was judged: what has its name by then may be another's.
@@ -44,10 +49,14 @@ Result<void> ZORClientConnection::makeSubdirectories(const ContainerLayout& layo
         const std::string_view above = slash == path.npos ? "" : path.substr(0, slash);
         if (!open.contains(above))
             open.emplace("", TRY(fileManager.openDirectoryOf(layout.topLevelOwner, container)));
+        // One that is there keeps its class: its owner's, or an earlier change's.
+        const bool isNew = fileManager.itemDoesNotExistAtURL(container.appendingDirectory(path));
         return fileManager.openOrCreateDirectoryBelow(
             open.at(above).get(), above.empty() ? container : container.appendingDirectory(above),
             std::string(path.substr(slash == path.npos ? 0 : slash + 1)), Intermediates::yes,
-            {.mode = layout.subdirectoryMode, .owner = layout.subdirectoryOwner});
+            {.mode = layout.subdirectoryMode,
+             .owner = layout.subdirectoryOwner,
+             .protectionClass = isNew ? protectionClass : protectionClassUnchanged});
     };
     for (const char* subdirectory : layout.subdirectories) {
         changed.push_back(container.appendingDirectory(subdirectory));
@@ -65,13 +74,19 @@ Result<void> ZORClientConnection::regenerateDirectoryUUIDForUser(const Container
     return services_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
         constexpr const char* function = "regenerateDirectoryUUIDForUser";
         TRY(checkAddress(function, address));
-        FileURL place;
+        FileURL newUrl;
+        std::shared_ptr<ZORMetadata> renamed;
+        if (!services_.waitingReplaces.none()) {
+            const AllIdentifiersLock lock(services_.locks, LockMode::writing);
+            (void)TRY(settledContainer(address.userId, address.containerClass,
+                                       address.identifier ? &*address.identifier : nullptr, *address.uuid));
+        }
         {
             const IdentifierLock lock(services_.locks, address.uuid->string(), LockMode::writing);
             const auto record = TRY(knownContainer(function, address));
             const FileURL oldUrl = record->url();
-            place = oldUrl.deletingLastPathComponent();
-            const FileURL newUrl = place.appendingDirectory(UUID::random().string());
+            const FileURL place = oldUrl.deletingLastPathComponent();
+            newUrl = place.appendingDirectory(UUID::random().string());
             const auto moved = [&]() -> Result<void> {
                 const std::uint32_t owner =
                     ZORGlobalConfiguration::ownerOfClassDirectory(address.containerClass, address.userId);
@@ -84,21 +99,23 @@ Result<void> ZORClientConnection::regenerateDirectoryUUIDForUser(const Container
                 return makeError(services_.log, {function, __LINE__}, ErrorCode::directoryNotRenamed, &moved.error(),
                                  LogFlag::yes, "Failed to move dir: %s to new UUID dir: %s", oldUrl.c_str(),
                                  newUrl.c_str());
-            if (isPerUserClass(address.containerClass) &&
+            const bool transient = record->transient(); // the mapping is the live one's
+            if (isPerUserClass(address.containerClass) && !transient &&
                 !_setSandboxContainerMappingForUser(address.userId, record->identifier(), address.containerClass,
                                                     newUrl))
                 services_.log.write(logLevelError, function, "Failed to set container mapping in regenerate operation");
-            const bool transient = record->transient();
+            record->setDurable(false);
             const auto added =
                 services_.cache.addContainerMetadata(record, address.userId, ContainerPlace(newUrl), transient);
             if (!added)
                 return makeError(services_.log, {function, __LINE__}, ErrorCode::cacheAddFailed, &added.error(),
                                  LogFlag::yes, "Failed to add to cache: %s, url: %s, transient: %d",
                                  ZOR_SHOWN(record->identifier()), newUrl.c_str(), transient);
+            renamed = record;
         }
-        if (const auto failed = syncDirectories({place}))
-            return makeError(services_.log, {function, __LINE__}, ErrorCode::directoryNotRenamed, &*failed,
-                             LogFlag::yes, "Failed to move dir: %s to new UUID dir: %s", place.c_str(), place.c_str());
+        if (const auto failed = syncDirectories({newUrl.deletingLastPathComponent()}))
+            return notLasting(function, ErrorCode::directoryNotRenamed, newUrl, *failed);
+        renamed->setDurable(true);
         return {};
     });
 }
