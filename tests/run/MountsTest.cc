@@ -7,6 +7,7 @@
 #include <filesystem>
 #include <functional>
 #include <gtest/gtest.h>
+#include <sys/mount.h>
 
 namespace zorvanerun {
 namespace {
@@ -85,9 +86,14 @@ TEST(Mounts, WhatIsNoContainerIsRefused) {
              files::remove_all(path);
              EXPECT_EQ(::mkfifo(path.c_str(), 0644), 0);
          }},
+        {"mount point",
+         [](const World& world, const std::string& path) {
+             EXPECT_EQ(::mount(world.below("elsewhere").c_str(), path.c_str(), nullptr, MS_BIND, nullptr), 0);
+         }},
     };
     for (const auto& [problem, swap] : swaps) {
-        for (int kind = 0; kind < 4; ++kind) {
+        const int kinds = std::string_view(problem) == "mount point" ? 2 : 4; // the others are where only root mounts
+        for (int kind = 0; kind < kinds; ++kind) {
             World world;
             const std::string paths[] = {world.told.data, world.told.applicationGroups["group.a"],
                                          *world.told.systemContainer, world.told.systemGroups["systemgroup.a"]};
@@ -95,6 +101,7 @@ TEST(Mounts, WhatIsNoContainerIsRefused) {
             const std::string said = world.open();
             EXPECT_NE(said.find(problem), std::string::npos) << paths[kind] << ": " << said;
             EXPECT_NE(said.find(paths[kind]), std::string::npos) << said;
+            (void)::umount2(paths[kind].c_str(), MNT_DETACH);
         }
     }
 }
@@ -102,7 +109,9 @@ TEST(Mounts, WhatIsNoContainerIsRefused) {
 // Nothing is started on a container that is locked: the program would find nothing of its own, and could make nothing.
 TEST(Mounts, ALockedContainerIsRefused) {
     World world;
-    zor::support::EncryptedDisk disk(world.below("private/var/mobile/Containers/Data/Application/E"));
+    world.told.home = world.below("private/var/other");
+    world.told.applicationGroups.clear();
+    zor::support::EncryptedDisk disk(world.told.home);
     if (!disk.missing().empty())
         GTEST_SKIP() << "skipped: " << disk.missing();
     World::make(disk.directory() + "/tmp", world.user());

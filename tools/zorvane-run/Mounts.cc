@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Mounts.h"
 
+#include "fs/MountFences.h"
 #include "platform/linux/HiddenNames.h"
 #include "platform/linux/Openat2.h"
 
@@ -47,7 +48,18 @@ Failure notFound(const std::string& cannot, const std::string& path, const std::
 
 std::expected<FileDescriptor, int> openPlain(const Root& root, const std::string& path) {
     const std::string relative = path.substr(root.path == "/" ? 1 : root.path.size() + 1);
-    auto opened = openBeneath(root.descriptor.get(), relative.c_str(), O_PATH | O_DIRECTORY);
+    return openBeneath(root.descriptor.get(), relative.c_str(), O_PATH | O_DIRECTORY);
+}
+
+/// A container below the home, if there is one. Whoever owns a directory there can mount a file system that never
+/// answers: none is entered.
+std::expected<FileDescriptor, int> openContainer(const Root& root, const std::string& path, const std::string& home) {
+    using zor::fs::MountFence;
+    const std::size_t begin = root.path == "/" ? 1 : root.path.size() + 1;
+    auto opened = home.empty()
+                      ? openPlain(root, path)
+                      : MountFence(root.descriptor.get(), std::string_view(home).substr(begin), MountFence::Kind::home)
+                            .open(path.c_str() + begin, O_PATH | O_DIRECTORY);
     // A program would find nothing of its own there, and make it anew.
     if (opened && zor::platform::hidesNames(opened->get()))
         return std::unexpected(ENOKEY);
@@ -55,6 +67,8 @@ std::expected<FileDescriptor, int> openPlain(const Root& root, const std::string
 }
 
 std::string cannotOpen(const std::string& place, int error) {
+    if (error == EXDEV)
+        return place + " is a mount point, or lies behind one";
     if (error == ELOOP)
         return place + " is a symbolic link, or lies behind one";
     if (error == ENOKEY)
@@ -64,8 +78,8 @@ std::string cannotOpen(const std::string& place, int error) {
 
 class Collector {
 public:
-    Collector(const Root& root, const Options& options, std::vector<Mount>& mounts)
-        : root_(root), options_(options), mounts_(mounts) {}
+    Collector(const Root& root, const Options& options, const std::string& home, std::vector<Mount>& mounts)
+        : root_(root), options_(options), home_(home), mounts_(mounts) {}
 
     Result<void> container(Mount::Kind kind, const std::string& identifier, const std::string& path) {
         const std::string what = "the " + std::string(kindName(kind)) + " container of " + identifier;
@@ -76,7 +90,8 @@ public:
         const std::string advice =
             "somebody has changed the directory: look who can write to the one that holds it, and put the container "
             "back where it was";
-        auto directory = openPlain(root_, path);
+        const bool users = kind == Mount::Kind::data || kind == Mount::Kind::applicationGroup;
+        auto directory = openContainer(root_, path, users ? home_ : std::string());
         if (!directory && directory.error() == ENOENT)
             return std::unexpected(notFound(cannotOpen(what + " " + path, ENOENT), path, advice));
         if (!directory)
@@ -84,7 +99,6 @@ public:
         struct stat status{};
         if (::fstat(directory->get(), &status) != 0)
             return failed(withReason(what + " " + path + " cannot be read", errno), advice);
-        const bool users = kind == Mount::Kind::data || kind == Mount::Kind::applicationGroup;
         const bool owned =
             users ? status.st_uid == options_.user : status.st_uid == rootUser || status.st_uid == systemUser;
         if (!S_ISDIR(status.st_mode) || !owned)
@@ -155,6 +169,7 @@ public:
 private:
     const Root& root_;
     const Options& options_;
+    const std::string& home_;
     std::vector<Mount>& mounts_;
 };
 
@@ -194,7 +209,7 @@ Result<std::vector<Mount>> openMounts(const Root& root, const Options& options, 
     if (!device)
         return std::unexpected(device.error());
     std::vector<Mount> mounts;
-    Collector collector(root, options, mounts);
+    Collector collector(root, options, told.home, mounts);
     Result<void> done = collector.operatingSystem(*device);
     const std::vector<std::string> containers = pathsOf(told);
     for (const std::string& path : options.readOnly)
