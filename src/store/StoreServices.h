@@ -17,6 +17,7 @@
 #include "store/ZORContainerCache.h"
 #include "store/ZORGlobalConfiguration.h"
 
+#include <atomic>
 #include <functional>
 #include <memory>
 
@@ -52,6 +53,8 @@ struct StoreServices {
     std::shared_ptr<ZORClientConnection> sharedClientConnection;
     SetupReport setup{};
     StoreLimits limits{};
+    /// A pass over death row that nobody is told of is queued and has not begun.
+    std::atomic<bool> deletionPassWaits{false};
     WaitingReplaces waitingReplaces{};
 };
 

@@ -113,7 +113,7 @@ TEST_F(DeathRow, APassKeepsTheDaemonBusy) {
         world.makeDirectories(item);
         ASSERT_TRUE(condemn(item, StartDeletionThread::yes));
     }
-    EXPECT_EQ(roles.transactions.count(), 3U);
+    EXPECT_EQ(roles.transactions.count(), 1U) << "a pass finds all that is there";
     EXPECT_EQ(world.deathRow(), (Names{"a", "b", "c"}));
     roles.deathRowQueue.resume();
     EXPECT_EQ(world.pass(), ErrorCode::success);

@@ -146,6 +146,22 @@ TEST_F(Dispatch, TheDeferredReplyComesOnceAfterThePass) {
     EXPECT_EQ(connection.cancelled, 0);
 }
 
+// Goal: a client without powers cannot pile up work that keeps the daemon busy. Method: with the queue held, it has one
+// transient container after the other thrown away.
+TEST_F(Dispatch, PassesDoNotPileUp) {
+    const platform::Platform platform = world.linux().roles();
+    platform.deathRowQueue.suspend();
+    for (int i = 0; i < 20; ++i)
+        handle({.kind = Kind::message,
+                .request = {{"ContainerClass", 2}, {"UserID", 501}, {"CreateIfNecessary", true}, {"Transient", true}},
+                .reply = std::make_shared<FakeReply>()});
+    EXPECT_EQ(platform.transactions.count(), 1U);
+    EXPECT_EQ(world.names(dead).size(), 19U);
+    platform.deathRowQueue.resume();
+    world.drainDeathRow();
+    EXPECT_TRUE(world.names(dead).empty());
+}
+
 // Goal: command 0 from keys to keys. Method: requests in a row, each with the reply's whole content or its error.
 TEST_F(Dispatch, CreatesAndLooksUp) {
     // Without "Command" it is command 0, and so it is with one that is no unsigned number.

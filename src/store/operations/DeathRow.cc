@@ -50,9 +50,24 @@ Result<void> ZORClientConnection::_moveItemAtURLToDeathRow(const FileURL& url,
 }
 
 void ZORClientConnection::deleteContainersOnDeathRowWithCompletion(std::function<void(ErrorCode)> completion) {
-    ZORDispatchAsyncWithTransaction(
-        services_.transactions, services_.deathRowQueue,
-        [self = shared_from_this(), completion = std::move(completion)] { self->runDeletionPass(completion); });
+    // A pass that has not begun finds what comes until then: only who wants to be told of its end needs another. Else
+    // whoever sends something here over and over would queue passes without end, each of which keeps the daemon busy.
+    std::atomic<bool>& waits = services_.deletionPassWaits;
+    const bool isAwaited = completion != nullptr;
+    if (!isAwaited && waits.exchange(true))
+        return;
+    try {
+        ZORDispatchAsyncWithTransaction(services_.transactions, services_.deathRowQueue,
+                                        [self = shared_from_this(), completion = std::move(completion), isAwaited] {
+                                            if (!isAwaited)
+                                                self->services_.deletionPassWaits = false;
+                                            self->runDeletionPass(completion);
+                                        });
+    } catch (...) {
+        if (!isAwaited)
+            waits = false;
+        throw;
+    }
 }
 
 void ZORClientConnection::runDeletionPass(const std::function<void(ErrorCode)>& completion) {
