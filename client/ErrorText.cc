@@ -21,7 +21,7 @@ constexpr Row rows[] = {
     {1, {"done", "the daemon did what was asked", "what was asked for is on the disk", "nothing"}},
     {4,
      {"an item on death row could be neither deleted nor moved to the temporary directory",
-      "the file system is full, damaged or read-only, or the item is immutable or a mount point",
+      "the file system is full, damaged or read-only, or the item is a mount point",
       "it stays on death row; the next pass tries again", seeDisk}},
     {5,
      {"the old transient container could not be taken away", diskFailed,
@@ -93,7 +93,9 @@ constexpr Row rows[] = {
      {"a file of the container manager could not be written",
       "the file system is full, damaged or read-only, or the values do not fit into the file, or not beside those of "
       "the user's other containers",
-      "the old file holds", seeDisk}},
+      "the file, if there was one, is as it was, and no container was moved; an info value that could not be saved is "
+      "shown until the daemon is next started, where it would have fit",
+      seeDisk}},
     {35,
      {"the journal of a replace is unreadable or could not be recovered",
       "the file was changed by somebody else, or a move back or a sync failed",
@@ -101,8 +103,9 @@ constexpr Row rows[] = {
       "repair what the daemon's log names, then ask again: each request tries the recovery, and so does the next "
       "start"}},
     {36,
-     {"a replace was done, but not cleaned up", diskFailed,
-      "the old container, or the journal, lies there until the daemon is next started", seeLog}},
+     {"what a replace leaves behind could not be cleaned up, whether the replace was done or not", diskFailed,
+      "a journal, or a container that waits in staging, lies there until the daemon is next started",
+      "look the identifier up to see which container it has; the daemon's log says what stood in the way"}},
     {38,
      {"this user, key, class or data-protection class is not allowed here",
       "the request asks for what no client, or not this one, may have", "nothing was changed",

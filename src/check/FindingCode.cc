@@ -57,7 +57,7 @@ constexpr std::array<FindingPage, findingCodeCount> pages = {{
      "move it aside, with the command that the check names, and repair the container"},
     {FindingCode::protectionDiffers, "protection-differs", fault,
      "a container's directories have another data-protection class than the one recorded",
-     "a change of the class was stopped midway, or the program made the directory anew",
+     "a change of the class was stopped midway or could not be recorded, or the program made the directory anew",
      "files are kept less, or more, strictly than the record says",
      "ask for another class and then for the recorded one again: zorvanectl protect. A change that waits for an unlock "
      "is "

@@ -2,6 +2,7 @@
 #include "check/WorkCheck.h"
 
 #include "fs/AtomicFile.h"
+#include "fs/FileSystemDeathRow.h"
 #include "fs/LeftoverNames.h"
 #include "platform/PercentEncoding.h"
 #include "platform/linux/DirectoryNames.h"
@@ -55,14 +56,27 @@ void WorkCheck::checkStaging() {
 
 void WorkCheck::checkDeathRow() {
     const FileURL deathRow = look_.device().places().deathrowDirectory();
-    const auto directory = look_.openDirectory(deathRow);
-    if (!directory)
-        return;
-    look_.forEachName(directory->get(), deathRow, [&](const char* name) {
-        if (look_.options().daemonServes && isYoung(directory->get(), name))
+    if (const auto directory = look_.openDirectory(deathRow))
+        addDeathRowItems(directory->get(), deathRow);
+    // That of each other file system.
+    std::vector<FileURL> places = look_.device().places().placesOfSharedContainers();
+    for (const MobileUser& user : look_.users())
+        places.push_back(user.home);
+    std::set<std::pair<dev_t, ino_t>> seen;
+    for (const FileURL& place : places) {
+        const auto top = fs::topOfMount(look_.device().fileManager().resolver(), place);
+        if (!top || !seen.insert(top->identity).second)
+            continue;
+        if (const auto directory = fs::openDeathRow(top->directory.get()))
+            addDeathRowItems(directory->get(), fs::deathRowBelow(top->url));
+    }
+}
+
+void WorkCheck::addDeathRowItems(int directory, const FileURL& row) {
+    look_.forEachName(directory, row, [&](const char* name) {
+        if (look_.options().daemonServes && isYoung(directory, name))
             return;
-        look_.add(FindingCode::deathRowItem, deathRow.appendingDirectory(name), "waits for its deletion",
-                  Mender::daemon);
+        look_.add(FindingCode::deathRowItem, row.appendingDirectory(name), "waits for its deletion", Mender::daemon);
     });
 }
 

@@ -14,6 +14,7 @@ public:
 private:
     void checkStaging();
     void checkDeathRow();
+    void addDeathRowItems(int directory, const FileURL& row);
     void checkJournals();
     void addJournal(const FileURL& url);
     void checkLibrary();

@@ -27,6 +27,11 @@ int Daemon::run() {
         return -1;
     }
     setUp();
+    if (composition_.store().setup.stopped()) {
+        composition_.log().write(logLevelNotice, "main",
+                                 "Told to end before the setup was done; the next start goes on");
+        return 0;
+    }
     followLockState();
     evaluateLockState();
     if (!startUpcallServer()) {
@@ -65,6 +70,8 @@ void Daemon::setUp() {
     const platform::Platform& platform = composition_.platform();
     const Log& log = composition_.log();
     const auto& client = composition_.sharedClientConnection();
+    SetupReport& setup = composition_.store().setup;
+    setup.setSurroundings({.progress = options_.settingUp, .stopWanted = options_.stopWanted});
     if (options_.containersPerUser)
         composition_.store().limits.containersMaxPerUser = *options_.containersPerUser;
     if (const auto homeWasOpen = composition_.configuration().closeHomeDirectory(); !homeWasOpen)
@@ -78,11 +85,12 @@ void Daemon::setUp() {
     if (!marker.present) {
         log.write(logLevelNotice, "main", "zorvaned performing first boot initialization");
         client->rebootContainerManagerSetup();
-        if (const int failure = platform.bootMarker.make())
+        if (const int failure = setup.stopped() ? 0 : platform.bootMarker.make())
             log.write(logLevelError, "set_first_boot_work_completed", "Failed to create semaphore %s: %s",
                       platform.bootMarker.name().c_str(), errorText(failure));
     }
-    client->containerManagerSetup();
+    if (!setup.stopped())
+        client->containerManagerSetup();
 }
 
 void Daemon::followLockState() {

@@ -2,7 +2,8 @@
 // The daemon's life: start-up in its fixed order, the lock-state follower, and the run loop.
 //
 // Runs on the main thread. Before the listener is made, no client is served; the setup is alone with the disk. A stop
-// during start-up leaves what the setup's own steps leave, and the next launch begins anew.
+// during start-up leaves what the setup's own steps leave, and the next launch begins anew; one that was asked for
+// counts as a run that ended well.
 #pragma once
 
 #include "daemon/Composition.h"
@@ -24,6 +25,10 @@ public:
         std::function<void()> beforeClients;
         /// Runs when clients can connect, before the run loop: tells the service manager.
         std::function<void()> ready;
+        /// Told every few seconds while the setup goes on: keeps the service manager from taking it for hung.
+        std::function<void()> settingUp;
+        /// Asked between the setup's items; with true the daemon ends without serving, and the next launch goes on.
+        std::function<bool()> stopWanted;
     };
     Daemon(Composition& composition, Options options) : composition_(composition), options_(std::move(options)) {}
     Daemon(const Daemon&) = delete;

@@ -75,11 +75,19 @@ void Status::addProtection(plist::Dictionary& counters) {
     counters.set("HeldAssertions", plist::Array(held.begin(), held.end()));
 }
 
+void Status::addDeathRow(plist::Dictionary& counters) {
+    const DeathRowReport::Left left = composition_.store().deathRow.left();
+    counters.set("UndeletedItems", left.count);
+    counters.set("UndeletedPaths", plist::Array(left.paths.begin(), left.paths.end()));
+}
+
 void Status::addSetup(plist::Dictionary& counters) {
     plist::Array passes;
     for (const auto& pass : composition_.store().setup.passes())
-        passes.emplace_back(
-            plist::Dictionary{{"Pass", pass.name}, {"Changed", pass.changed}, {"Microseconds", pass.microseconds}});
+        passes.emplace_back(plist::Dictionary{{"Pass", pass.name},
+                                              {"Changed", pass.changed},
+                                              {"Microseconds", pass.microseconds},
+                                              {"Failed", pass.failed}});
     counters.set("LastSetup", std::move(passes));
 }
 
@@ -102,6 +110,7 @@ plist::Dictionary Status::counters() {
     };
     addProtection(counters);
     addSetup(counters);
+    addDeathRow(counters);
     if (const auto lost = composition_.entitlements().lostFile())
         counters.set("UnreadableEntitlementFile", lost->path());
     platformCounters_(counters);

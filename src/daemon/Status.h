@@ -26,6 +26,7 @@ private:
     [[nodiscard]] plist::Dictionary counters();
     void addProtection(plist::Dictionary& counters);
     void addSetup(plist::Dictionary& counters);
+    void addDeathRow(plist::Dictionary& counters);
     void addEntitlements(plist::Dictionary& status);
 
     Composition& composition_;

@@ -14,11 +14,13 @@
 #include "daemon/base/Result.h"
 #include "daemon/base/UUID.h"
 #include "daemon/base/ZORLocks.h"
+#include "platform/Mutex.h"
 #include "plist/Value.h"
 #include "store/WaitingReplaces.h"
 #include "store/ZORMetadata.h"
 
 #include <atomic>
+#include <cerrno>
 #include <cstddef>
 #include <cstdint>
 #include <expected>
@@ -197,9 +199,11 @@ public:
     Result<ListedPage> containersForUser(std::uint32_t userId, ContainerClass containerClass, bool transient,
                                          const std::string& after);
 
-    // Death row (DeathRow.cc).
-    /// Moves an item away; a missing one is no failure. Error 41.
-    Result<void> _moveItemAtURLToDeathRow(const FileURL& url, StartDeletionThread startDeletionThread);
+    // Death row (DeathRow.cc, DeletionPass.cc).
+    /// Moves an item away, never by a copy; a missing one is no failure. With `owner`, a directory of another
+    /// user's stays, and the cause of the error is notTheContainer. Error 41.
+    Result<void> _moveItemAtURLToDeathRow(const FileURL& url, StartDeletionThread startDeletionThread,
+                                          std::optional<std::uint32_t> owner = std::nullopt);
     /// Queues one deletion pass; the completion runs on the death-row queue with success or the pass's last error code.
     void deleteContainersOnDeathRowWithCompletion(std::function<void(ErrorCode)> completion);
     /// Removes an item, or moves it to the system's directory for temporary files. Error 4.
@@ -232,10 +236,8 @@ private:
 
     /// One element; `changed` gets the directories to be synced.
     Result<void> stageForDelete(const DeletionBatch& batch, std::size_t index, std::vector<FileURL>& changed);
-    /// Error, not logged, when the container still lies in its place.
-    Result<void> moveAwayForDelete(const FileURL& container, const FileURL& destination);
-    /// False, logged, when the container stays where it is.
-    bool takeAwayForDelete(const FileURL& container, std::vector<FileURL>& changed);
+    /// False, logged, when the container stays where it is. `owner` as _moveItemAtURLToDeathRow has it.
+    bool takeAwayForDelete(const FileURL& container, std::optional<std::uint32_t> owner, std::vector<FileURL>& changed);
     /// The standard subdirectories of the container that `changed` begins with; each is added to it. New ones get the
     /// protection class.
     Result<void> makeSubdirectories(const ContainerLayout& layout, int protectionClass, std::vector<FileURL>& changed);
@@ -293,8 +295,32 @@ private:
     void keepDiskUsage(const ContainerAddress& address, const FileURL& measured, std::uint64_t bytes);
     Result<void> checkWipe(std::uint32_t userId, const std::string* identifier, ContainerClass containerClass);
 
+    /// POSIX code of an item that is not the container that it lies in the place of.
+    static constexpr int notTheContainer = ESTALE;
+    enum class DeathRow : std::uint8_t { ofRoot, ofFileSystem };
+    /// Moves an item to `destination` on root's death row, or where that is another file system to the row of its own.
+    /// `moving` is the lock of moves to death row. Errors are not logged.
+    Result<DeathRow> condemn(const FileURL& url, const FileURL& destination, std::optional<std::uint32_t> owner,
+                             const platform::MutexLock& moving);
+    /// `from` is open and holds the item.
+    Result<void> condemnOnItsFileSystem(int from, const FileURL& url, std::optional<std::uint32_t> owner);
+    /// Error notTheContainer for a directory of another's.
+    Result<void> judgeOwner(int directory, const FileURL& url, std::uint32_t owner);
+    /// The same of `destination` in `to`, with the item again where it was, or beside that.
+    Result<void> putBackIfAnothers(int from, const FileURL& url, int to, const FileURL& destination,
+                                   std::uint32_t owner);
+
+    struct DeletionPass;
     void runDeletionPass(const std::function<void(ErrorCode)>& completion);
-    std::optional<ZORError> deleteEverythingOnDeathRow();
+    void deleteEverythingOnDeathRow(DeletionPass& pass);
+    /// The row of the file system that `place` lies on.
+    void deleteEverythingOnDeathRowOf(const FileURL& place, DeletionPass& pass);
+    /// Each item of an open row to `remove`; the error says that not all could be read.
+    Result<void> forEachCondemned(int directory, const FileURL& row,
+                                  const std::function<Result<void>(const FileURL&)>& remove, DeletionPass& pass);
+    Result<void> moveToTemporary(const FileURL& url, const FileURL& destination);
+    void findInTemporary(int directory, const FileURL& temporary);
+    void deleteWhatIsInTemporary();
     enum class Orphan : std::uint8_t { no, byName, noMetadata };
     /// `classDirectory` is open and holds the entry. Several threads may ask at once.
     Orphan orphanKind(int classDirectory, const FileURL& entry, ContainerClass containerClass);
@@ -302,7 +328,10 @@ private:
     // Passes of the setup; each gives the number of items it changed.
     std::uint64_t migrateBundles();
     std::uint64_t migrateWellknown();
-    std::uint64_t discardAtBoot(const std::optional<FileURL>& url, const char* what);
+    std::uint64_t discardAtBoot(const std::optional<FileURL>& url, const char* what,
+                                std::optional<std::uint32_t> owner);
+    /// `classDirectory` is open and holds the entries. How many went.
+    std::uint64_t removeOrphans(int classDirectory, const std::vector<FileURL>& entries, ContainerClass containerClass);
     /// Copies across file systems that a stop cut short: hidden, so no listing shows them.
     void discardCopyLeftovers(const FileURL& directory);
     std::uint64_t cleanUpUsers();

@@ -17,6 +17,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <malloc.h>
+#include <string_view>
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -28,6 +29,10 @@ using namespace zor;
 
 /// Two arenas serve the few threads that run at once; one for each thread that ever was would keep memory for ever.
 constexpr int mallocArenas = 2;
+
+/// What the service manager is told while the setup goes on: it waits this long, in microseconds, for the next word.
+/// One item, perhaps a large tree that an old system left on another file system, may take minutes.
+constexpr std::string_view setupGoesOn = "EXTEND_TIMEOUT_USEC=600000000";
 
 /// False when a standard descriptor is missing and stays so: its number would be some container's or client's.
 [[nodiscard]] bool prepareProcess() {
@@ -72,10 +77,16 @@ public:
         : loop_(platform.runLoop()), transactions_(platform.roles().transactions) {
         transactions_.onIdle([this] { stopIfWanted(); });
         loop_.watch(signals_.get(), [this] {
-            while (signals_.take())
-                wanted_ = true;
-            stopIfWanted();
+            if (isWanted())
+                stopIfWanted();
         });
+    }
+
+    /// For who keeps the loop from running. Main thread.
+    bool isWanted() {
+        while (signals_.take())
+            wanted_ = true;
+        return wanted_;
     }
 
 private:
@@ -151,7 +162,7 @@ int main(int argumentCount, char** arguments) {
     if (options->forgetBoot)
         (*platform)->bootMarker().forget();
 
-    const StopOnSignal stop(**platform);
+    StopOnSignal stop(**platform);
     Composition composition((*platform)->roles());
     const auto notify = platform::NotifySocket::ofEnvironment();
     Status status(composition, [&](plist::Dictionary& counters) {
@@ -168,7 +179,9 @@ int main(int argumentCount, char** arguments) {
                                         sayIfConnectionsAreFew(limits, descriptorsMax, composition.log());
                                         openStatus(**platform, statusSocket, composition.log());
                                     },
-                                .ready = [&] { (void)notify.send("READY=1"); }});
+                                .ready = [&] { (void)notify.send("READY=1"); },
+                                .settingUp = [&] { (void)notify.send(setupGoesOn); },
+                                .stopWanted = [&] { return stop.isWanted(); }});
     const int exitStatus = daemon.run();
     (void)notify.send("STOPPING=1");
     statusSocket.close();

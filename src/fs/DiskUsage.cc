@@ -73,6 +73,8 @@ private:
     void measureDirectory(const std::string& path);
     void measureEntries(int directory, const std::string& path);
     [[nodiscard]] bool isInTree(int directory) const;
+    void noteChange(const struct stat& status);
+    void noteChangeOf(int directory);
     void addDirectory(int directory, const std::string& path, const char* name);
     /// `makePath` is called only for a message.
     template <typename MakePath>
@@ -115,7 +117,20 @@ Usage Measurement::run() {
         queuedBytes_ -= path.size();
         measureDirectory(path);
     }
+    noteChangeOf(root_); // as it is after the walk
     return usage_;
+}
+
+void Measurement::noteChange(const struct stat& status) {
+    const auto sinceEpoch =
+        std::chrono::seconds(status.st_ctim.tv_sec) + std::chrono::nanoseconds(status.st_ctim.tv_nsec);
+    usage_.lastChange = std::max(usage_.lastChange, std::chrono::system_clock::time_point(sinceEpoch));
+}
+
+void Measurement::noteChangeOf(int directory) {
+    struct stat status{};
+    if (::fstat(directory, &status) == 0)
+        noteChange(status);
 }
 
 void Measurement::measureDirectory(const std::string& path) {
@@ -140,6 +155,7 @@ bool Measurement::isInTree(int directory) const {
 }
 
 void Measurement::measureEntries(int directory, const std::string& path) {
+    noteChangeOf(directory);
     BulkDirectoryRead entries(directory, buffer_);
     std::uint64_t index = 0;
     for (; const BulkDirectoryRead::Entry* entry = entries.next(); ++index) {
@@ -181,6 +197,7 @@ void Measurement::addDirectory(int directory, const std::string& path, const cha
 
 template <typename MakePath>
 void Measurement::addNonDirectory(const struct stat& status, MakePath makePath) {
+    noteChange(status);
     if (status.st_nlink == 1 || seen_.insert(status.st_ino).second)
         usage_.bytes += static_cast<std::uint64_t>(status.st_blocks) * blockBytes;
     else if (logs(logLevelDebug))
@@ -212,6 +229,8 @@ void Measurement::addWalkEntry(const WalkEntry& entry, const std::string& top) {
     const auto path = [&] { return entry.depth == 0 ? top : top + '/' + entry.path(); };
     switch (entry.kind) {
     case WalkEntryKind::directory:
+        noteChange(entry.status);
+        return;
     case WalkEntryKind::directoryEnd:
         return;
     case WalkEntryKind::unreadableDirectory:

@@ -8,6 +8,7 @@
 // number at once.
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <string>
@@ -25,6 +26,8 @@ struct Usage {
     std::uint64_t bytes = 0;
     /// This process ran out of descriptors or memory meanwhile: some of the tree is not in it.
     bool cutShort = false;
+    /// When the last of what was examined, directories too, was changed (ctime, which nobody can set).
+    std::chrono::system_clock::time_point lastChange{};
 };
 
 /// `path` names the directory, open for reading, in messages and serves nothing else. Its offset is moved.

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// Names that only a stop leaves behind. None of them is ever taken for the real thing. What an atomic write leaves is
+// Names that a stop may leave behind. None of them is ever taken for the real thing. What an atomic write leaves is
 // named in AtomicFile.h.
 #pragma once
 
@@ -9,6 +9,10 @@ namespace zor::fs {
 
 /// How a copy across file systems is named until it is whole.
 inline constexpr const char* copyPrefix = ".zorvaned-copy-";
+
+/// The death row at the top of a file system (fs/FileSystemDeathRow.h), and the directory in it that holds the items.
+inline constexpr const char* deathRowOuter = ".zorvaned-dead";
+inline constexpr const char* deathRowInner = "com.veltra.zorvaned.dead";
 
 [[nodiscard]] inline bool isCopyLeftover(std::string_view name) {
     return name.starts_with(copyPrefix);

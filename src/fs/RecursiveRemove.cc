@@ -196,7 +196,7 @@ int clearImmutable(platform::Disk& disk, int directory, const char* name) {
         return -errno;
     if (!S_ISREG(status.st_mode) && !S_ISDIR(status.st_mode))
         return 0;
-    return clearInodeFlags(disk, item->get(), FS_IMMUTABLE_FL);
+    return clearInodeFlags(disk, item->get(), FS_IMMUTABLE_FL | FS_APPEND_FL);
 }
 
 } // namespace zor::fs

@@ -43,8 +43,9 @@ int removeTree(platform::Disk& disk, int directory, const char* name, const Remo
 /// Removes what can be removed. 0, or the first error that kept an item, as -errno.
 int removeTree(platform::Disk& disk, int directory, const char* name);
 
-/// Clears the immutable flag, and only that one, of a regular file or directory. 1 when it was set and is cleared, 0
-/// when it was not set (as on anything that cannot have it, links among them), or -errno.
+/// Clears the flags that keep an item from being removed, immutable and append-only, of a regular file or directory. 1
+/// when one was set and is cleared, 0 when none was (as on anything that cannot have them, links among them), or
+/// -errno.
 int clearImmutable(platform::Disk& disk, int directory, const char* name);
 
 } // namespace zor::fs

@@ -86,14 +86,18 @@ public:
 
     // Removal, copy, move.
     /// Removes a tree; what is missing is not missed. An item that cannot be removed lets the rest go and is the error.
-    /// An immutable file is made mutable and removed. Absent URL: EFAULT.
+    /// An immutable or append-only item is made mutable and removed. Absent URL: EFAULT.
     Result<void> removeItemAtURL(const std::optional<FileURL>& url);
+    /// The same of an item in a directory that is open; `url` is its name there, and in messages.
+    Result<void> removeItemIn(int directory, const FileURL& url);
     Result<void> copyItemAtURL(const FileURL& source, const FileURL& destination);
     Result<void> copyItemIfExistsAtURL(const FileURL& source, const FileURL& destination);
     Result<void> moveItemAtURL(const FileURL& source, const FileURL& destination);
     /// The same from and to directories that are open: it needs no descriptor then, unless it has to copy.
     enum class Moved { byName, byCopy };
     Result<Moved> moveItem(int fromDirectory, const FileURL& source, int toDirectory, const FileURL& destination);
+    /// The same by name alone: to another file system it fails with EXDEV.
+    Result<void> renameItem(int fromDirectory, const FileURL& source, int toDirectory, const FileURL& destination);
     Result<void> moveItemIfExistsAtURL(const FileURL& source, const FileURL& destination);
 
     // Walking and listing.
@@ -106,6 +110,14 @@ public:
     Result<void> standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid, uid_t formerOwner);
     /// The entries whose names do not begin with ".", in the directory's order. ENOKEY where an encryption hides them.
     Result<std::vector<FileURL>> urlsForItemsInDirectoryAtURL(const FileURL& directory);
+    /// The same, each to the visitor as it is read, so that no directory is too large for the memory; with a false
+    /// answer it is the last. The visitor gets the open directory too, and may remove the entry. What copies across
+    /// file systems left hidden is shown where it is asked for.
+    enum class Leftovers { hidden, shown };
+    using ItemVisitor = std::function<bool(int directory, const FileURL& item)>;
+    Result<void> forEachItemInDirectoryAtURL(const FileURL& directory, Leftovers leftovers, const ItemVisitor& visitor);
+    /// The same of a directory that is open; `url` is its name in messages.
+    Result<void> forEachItemIn(int directory, const FileURL& url, Leftovers leftovers, const ItemVisitor& visitor);
     /// What moves across file systems that were cut short left in a directory. Empty when it cannot be read.
     std::vector<FileURL> copyLeftoversInDirectoryAtURL(const FileURL& directory);
     /// The same for files whose atomic writing was cut short.

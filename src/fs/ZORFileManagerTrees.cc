@@ -16,6 +16,7 @@
 #include <cerrno>
 #include <dirent.h>
 #include <fcntl.h>
+#include <memory>
 #include <sys/stat.h>
 
 namespace zor {
@@ -55,14 +56,18 @@ Result<void> ZORFileManager::removeItemAtURL(const std::optional<FileURL>& url) 
     if (!parent)
         return posixError(ZOR_HERE, parent.error(), "prunetree of %s failed: %s", url->c_str(),
                           errorText(parent.error()));
+    return removeItemIn(parent->directory.get(), *url);
+}
+
+Result<void> ZORFileManager::removeItemIn(int directory, const FileURL& url) {
     int firstError = 0;
     static constexpr const char* function = "removeItemAtURL";
     fs::RemoveCallbacks callbacks;
     callbacks.directoryMadeMutable = [&](const std::string& path) {
-        log_.write(logLevelNotice, function, "Unset UF_IMMUTABLE on %s", ZOR_SHOWN(below(*url, path)));
+        log_.write(logLevelNotice, function, "Unset UF_IMMUTABLE on %s", ZOR_SHOWN(below(url, path)));
     };
     callbacks.failed = [&](const fs::RemoveFailure& failure) {
-        const std::string path = below(*url, failure.path);
+        const std::string path = below(url, failure.path);
         if (failure.error != ENOENT)
             log_.write(logLevelError, function, "prunetree hit error for %s : %s", ZOR_SHOWN(path),
                        errorText(failure.error));
@@ -89,11 +94,11 @@ Result<void> ZORFileManager::removeItemAtURL(const std::optional<FileURL>& url) 
             firstError = failure.error;
         return fs::RemoveAnswer::proceed;
     };
-    const int status = fs::removeTree(disk_, parent->directory.get(), parent->name.c_str(), callbacks);
+    const int status = fs::removeTree(disk_, directory, std::string(url.lastPathComponent()).c_str(), callbacks);
     const int number = status < 0 && status != -ENOENT ? -status : firstError;
     if (number == 0 || number == ENOENT)
         return {};
-    return posixError(ZOR_HERE, number, "prunetree of %s failed: %s", url->c_str(), errorText(number));
+    return posixError(ZOR_HERE, number, "prunetree of %s failed: %s", url.c_str(), errorText(number));
 }
 
 Result<void> ZORFileManager::copyItemAtURL(const FileURL& source, const FileURL& destination) {
@@ -170,16 +175,23 @@ Result<void> ZORFileManager::_moveItemAtURL(const FileURL& source, const FileURL
 
 Result<ZORFileManager::Moved> ZORFileManager::moveItem(int fromDirectory, const FileURL& source, int toDirectory,
                                                        const FileURL& destination) {
+    auto renamed = renameItem(fromDirectory, source, toDirectory, destination);
+    if (renamed)
+        return Moved::byName;
+    if (!renamed.error().isPosix(EXDEV))
+        return std::move(renamed).error();
+    TRY(moveAcrossFileSystems(fromDirectory, source, toDirectory, destination));
+    return Moved::byCopy;
+}
+
+Result<void> ZORFileManager::renameItem(int fromDirectory, const FileURL& source, int toDirectory,
+                                        const FileURL& destination) {
     const int status = disk_.rename(fromDirectory, std::string(source.lastPathComponent()).c_str(), toDirectory,
                                     std::string(destination.lastPathComponent()).c_str(), 0);
-    if (status == -EXDEV) {
-        TRY(moveAcrossFileSystems(fromDirectory, source, toDirectory, destination));
-        return Moved::byCopy;
-    }
-    if (status < 0)
-        return posixError(ZOR_HERE, -status, "rename of %s to %s failed: %s", source.c_str(), destination.c_str(),
-                          errorText(-status));
-    return Moved::byName;
+    if (status == 0)
+        return {};
+    return posixError({"moveItem", __LINE__}, -status, "rename of %s to %s failed: %s", source.c_str(),
+                      destination.c_str(), errorText(-status));
 }
 
 Result<void> ZORFileManager::moveAcrossFileSystems(int fromDirectory, const FileURL& source, int toDirectory,
@@ -309,36 +321,47 @@ Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t
 }
 
 Result<std::vector<FileURL>> ZORFileManager::urlsForItemsInDirectoryAtURL(const FileURL& directory) {
-    constexpr const char* label = "_IterateDirectory";
-    const auto failed = [&](int number) {
-        return posixError({"urlsForItemsInDirectoryAtURL", __LINE__}, number, "_IterateDirectory for %s returned %s",
-                          directory.c_str(), errorText(number));
-    };
+    std::vector<FileURL> urls;
+    TRY(forEachItemInDirectoryAtURL(directory, Leftovers::hidden, [&](int, const FileURL& item) {
+        urls.push_back(item);
+        return true;
+    }));
+    return urls;
+}
+
+Result<void> ZORFileManager::forEachItemInDirectoryAtURL(const FileURL& directory, Leftovers leftovers,
+                                                         const ItemVisitor& visitor) {
     const auto opened = resolver_.openDirectory(directory);
     const bool hidden = opened ? disk_.hidesNames(opened->get())
                                : opened.error() == ENOENT && fs::hiddenBy(resolver_, disk_, directory);
-    if (!opened || hidden) {
-        const int number = hidden ? ENOKEY : opened.error();
-        if (number != ENOENT)
-            log_.write(logLevelError, label, "opendir of %s failed: %s", directory.c_str(), errorText(number));
-        return failed(number);
-    }
-    std::vector<FileURL> urls;
-    fs::BulkDirectoryRead::Buffer buffer;
-    fs::BulkDirectoryRead entries(opened->get(), buffer);
+    if (opened && !hidden)
+        return forEachItemIn(opened->get(), directory, leftovers, visitor);
+    const int number = hidden ? ENOKEY : opened.error();
+    if (number != ENOENT)
+        log_.write(logLevelError, "_IterateDirectory", "opendir of %s failed: %s", directory.c_str(),
+                   errorText(number));
+    return posixError({"urlsForItemsInDirectoryAtURL", __LINE__}, number, "_IterateDirectory for %s returned %s",
+                      directory.c_str(), errorText(number));
+}
+
+Result<void> ZORFileManager::forEachItemIn(int directory, const FileURL& url, Leftovers leftovers,
+                                           const ItemVisitor& visitor) {
+    const auto buffer = std::make_unique<fs::BulkDirectoryRead::Buffer>();
+    fs::BulkDirectoryRead entries(directory, *buffer);
     while (const auto* entry = entries.next()) {
-        if (entry->name[0] == '.')
+        if (entry->name[0] == '.' && (leftovers == Leftovers::hidden || !fs::isCopyLeftover(entry->name)))
             continue;
         unsigned char type = entry->type;
         struct stat status{};
-        if (type == DT_UNKNOWN && fs::statusOfName(opened->get(), entry->name, status) == 0)
+        if (type == DT_UNKNOWN && fs::statusOfName(directory, entry->name, status) == 0)
             type = static_cast<unsigned char>(IFTODT(status.st_mode));
-        urls.push_back(type == DT_DIR ? directory.appendingDirectory(entry->name)
-                                      : directory.appendingFile(entry->name));
+        if (!visitor(directory, type == DT_DIR ? url.appendingDirectory(entry->name) : url.appendingFile(entry->name)))
+            return {};
     }
     if (entries.error() != 0)
-        return failed(entries.error());
-    return urls;
+        return posixError({"urlsForItemsInDirectoryAtURL", __LINE__}, entries.error(),
+                          "_IterateDirectory for %s returned %s", url.c_str(), errorText(entries.error()));
+    return {};
 }
 
 std::vector<FileURL> ZORFileManager::itemsNamed(const FileURL& directory, bool (*belongs)(std::string_view)) const {

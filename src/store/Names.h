@@ -33,6 +33,11 @@ inline constexpr std::string_view deathrow = "Dead";
 inline constexpr std::string_view replace = "Replace";
 inline constexpr std::string_view bundle = "Bundle";
 
+/// Extended attribute of what a deletion pass could not remove and moved to the directory for temporary files: the
+/// first where the daemon is root.
+inline constexpr const char* undeletedAttribute = "trusted.zorvane.undeleted";
+inline constexpr const char* undeletedAttributeUser = "user.zorvane.undeleted";
+
 /// In every data container: what is there for the while that its process runs.
 inline constexpr const char* containerTemporary = "tmp";
 

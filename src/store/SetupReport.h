@@ -1,11 +1,15 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the setup of this launch did, for the status: each pass with its time and how many items it changed.
+// What the setup of this launch does: each pass inside its own exception boundary, with its time and how many items it
+// changed, for the status; and between items, a word to whoever waits for the daemon, and a look whether it is to end.
 //
-// Written by the thread that starts the daemon, before anything is served; read afterwards.
+// Used by the thread that starts the daemon, before anything is served; passes() is read afterwards.
 #pragma once
+
+#include "daemon/base/ZORException.h"
 
 #include <chrono>
 #include <cstdint>
+#include <functional>
 #include <utility>
 #include <vector>
 
@@ -17,22 +21,55 @@ public:
         const char* name;
         std::uint64_t microseconds;
         std::uint64_t changed;
+        bool failed;
     };
+    /// Both may be absent.
+    struct Surroundings {
+        /// Told that the setup goes on, at most once in each progressPeriod.
+        std::function<void()> progress;
+        std::function<bool()> stopWanted;
+    };
+    static constexpr std::chrono::seconds progressPeriod{5};
 
-    /// Runs `pass`, which gives the number of items that it changed, and notes it under `name` (a literal).
+    explicit SetupReport(ExceptionBoundary& boundary) : boundary_(boundary) {}
+
+    void setSurroundings(Surroundings surroundings) { surroundings_ = std::move(surroundings); }
+
+    /// Between two items: false when the rest is to be left for the next launch.
+    bool goOn() {
+        const auto now = std::chrono::steady_clock::now();
+        if (surroundings_.progress && now - progressSaid_ >= progressPeriod) {
+            progressSaid_ = now;
+            surroundings_.progress();
+        }
+        stopped_ = stopped_ || (surroundings_.stopWanted && surroundings_.stopWanted());
+        return !stopped_;
+    }
+    [[nodiscard]] bool stopped() const { return stopped_; }
+
+    /// Runs `pass`, which gives the number of items that it changed, and notes it under `name` (a literal). Not when
+    /// the setup is to stop. An exception ends this pass alone.
     template <typename Function>
     void run(const char* name, Function&& pass) {
+        if (!goOn())
+            return;
         const auto begin = std::chrono::steady_clock::now();
-        const std::uint64_t changed = std::forward<Function>(pass)();
+        const auto changed =
+            boundary_.run({name, __LINE__}, [&]() -> Result<std::uint64_t> { return std::forward<Function>(pass)(); });
         const auto time = std::chrono::steady_clock::now() - begin;
         passes_.push_back({.name = name,
                            .microseconds = static_cast<std::uint64_t>(
                                std::chrono::duration_cast<std::chrono::microseconds>(time).count()),
-                           .changed = changed});
+                           .changed = changed.value_or(0),
+                           .failed = !changed});
     }
     [[nodiscard]] const std::vector<Pass>& passes() const { return passes_; }
 
 private:
+    ExceptionBoundary& boundary_;
+    Surroundings surroundings_;
+    std::chrono::steady_clock::time_point progressSaid_{};
+    bool stopped_ = false;
     std::vector<Pass> passes_;
 };
 

@@ -80,6 +80,10 @@ FileURL StorePlaces::formerBundleDirectory(ContainerClass containerClass) const 
     return formerContainersDirectory_.appendingDirectory(className(containerClass));
 }
 
+std::vector<FileURL> StorePlaces::placesOfSharedContainers() const {
+    return {homeDirectory_, sharedContainersDirectory_, brevadHomeDirectory_, formerContainersDirectory_};
+}
+
 FileURL StorePlaces::userBaseDirectory(const FileURL& home) {
     return home.appendingDirectory(names::userContainers);
 }

@@ -11,6 +11,7 @@
 #include "fs/PathResolver.h"
 
 #include <optional>
+#include <vector>
 
 namespace zor {
 
@@ -44,6 +45,9 @@ public:
     /// Where an older system kept bundle containers, and those of one class.
     [[nodiscard]] FileURL formerBundleDirectory() const;
     [[nodiscard]] FileURL formerBundleDirectory(ContainerClass containerClass) const;
+
+    /// Directories at or above all containers but those of mobile users.
+    [[nodiscard]] std::vector<FileURL> placesOfSharedContainers() const;
 
     // Of a mobile user with this home.
     [[nodiscard]] static FileURL userBaseDirectory(const FileURL& home);

@@ -11,6 +11,7 @@
 #include "platform/ServiceTransaction.h"
 #include "platform/TerminationAssertionService.h"
 #include "platform/WorkQueue.h"
+#include "store/DeathRowReport.h"
 #include "store/SetupReport.h"
 #include "store/StoreLimits.h"
 #include "store/WaitingReplaces.h"
@@ -18,6 +19,7 @@
 #include "store/ZORGlobalConfiguration.h"
 
 #include <atomic>
+#include <chrono>
 #include <functional>
 #include <memory>
 
@@ -51,7 +53,11 @@ struct StoreServices {
     platform::ServiceTransactions& transactions;
     /// The daemon's own client. It is made over these services, so it comes last; nothing runs before it is there.
     std::shared_ptr<ZORClientConnection> sharedClientConnection;
-    SetupReport setup{};
+    SetupReport setup{boundary};
+    DeathRowReport deathRow{};
+    /// A bundle in which nothing has changed for so long counts as filled: longer than an installation pauses, less
+    /// than somebody waits for a second look.
+    std::chrono::milliseconds usageSettledTime{10'000};
     StoreLimits limits{};
     /// A pass over death row that nobody is told of is queued and has not begun.
     std::atomic<bool> deletionPassWaits{false};

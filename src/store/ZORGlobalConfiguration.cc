@@ -150,6 +150,14 @@ FileURL ZORGlobalConfiguration::transientBundleDirectory() {
     return url;
 }
 
+std::vector<FileURL> ZORGlobalConfiguration::placesOfContainers() const {
+    std::vector<FileURL> places = places_.placesOfSharedContainers();
+    for (const auto& home : homes_)
+        if (auto seen = home->look(); seen.state == UserHome::State::present && seen.directory)
+            places.push_back(std::move(*seen.directory));
+    return places;
+}
+
 Result<bool> ZORGlobalConfiguration::closeHomeDirectory() {
     const FileURL& home = places_.homeDirectory();
     const fs::PathResolver& resolver = fileManager_.resolver();

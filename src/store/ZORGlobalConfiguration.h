@@ -58,6 +58,9 @@ public:
     [[nodiscard]] FileURL formerBundleDirectory(ContainerClass containerClass) const {
         return places_.formerBundleDirectory(containerClass);
     }
+    /// Directories at or above all containers, so that each file system that holds some is that of one of them. Some
+    /// may not be there.
+    [[nodiscard]] std::vector<FileURL> placesOfContainers() const;
     /// DIR/tmp; the system's, not made here.
     [[nodiscard]] FileURL temporaryDirectory() const { return places_.temporaryDirectory(); }
 

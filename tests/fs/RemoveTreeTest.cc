@@ -117,7 +117,7 @@ TEST(RemoveTree, ClearsFlagsOfDirectoriesInsideTheTree) {
     }
 }
 
-// The repair that a callback makes: the flag alone is cleared, links and FIFOs are left alone, and the removal then
+// The repair that a callback makes: both flags are cleared, links and FIFOs are left alone, and the removal then
 // succeeds.
 TEST(RemoveTree, LetsACallbackRepairImmutableFiles) {
     if (::geteuid() != 0)
@@ -135,7 +135,7 @@ TEST(RemoveTree, LetsACallbackRepairImmutableFiles) {
     EXPECT_EQ(clearImmutable(disk, root.get(), "missing"), -ENOENT);
     EXPECT_EQ(clearImmutable(disk, root.get(), "tree"), 0);
     EXPECT_EQ(clearImmutable(disk, root.get(), "tree/file"), 1);
-    EXPECT_EQ(flagsOf(root.get(), "tree/file"), FS_APPEND_FL);
+    EXPECT_EQ(flagsOf(root.get(), "tree/file"), 0);
     EXPECT_EQ(flagsOf(root.get(), "outside"), FS_IMMUTABLE_FL);
     setFlags(root.get(), "outside", 0);
     setFlags(root.get(), "tree/file", FS_IMMUTABLE_FL);

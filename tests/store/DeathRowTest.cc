@@ -1,8 +1,14 @@
 // SPDX-License-Identifier: Apache-2.0
-// Death row: what gets there, what a pass does with it, and the races between the two.
+// Death row: what gets there, on which file system, what a pass does with it, and the races between the two.
+#include "fs/LeftoverNames.h"
 #include "world/World.h"
 
+#include <filesystem>
 #include <gtest/gtest.h>
+#include <sched.h>
+#include <sys/mount.h>
+#include <sys/stat.h>
+#include <thread>
 #include <unistd.h>
 
 namespace zor::test {
@@ -18,6 +24,8 @@ class DeathRow : public testing::Test {
 protected:
     DeathRow() { world.load(); }
     World world;
+
+    Names left() { return world.services().store().deathRow.left().paths; }
 
     Result<void> condemn(std::string_view relative, StartDeletionThread start = StartDeletionThread::no) {
         return world.daemonsClient()._moveItemAtURLToDeathRow(world.url(relative), start);
@@ -87,12 +95,184 @@ TEST_F(DeathRow, WhatCannotBeRemoved) {
     EXPECT_TRUE(hasLine(said, 7, "_removeItemOrMoveToTempAtURL",
                         "Couldn't remove, so moving item to /tmp: " + item + " : POSIX 13 \"prunetree of " + item +
                             " failed: Permission denied\""));
+    EXPECT_EQ(left(), (Names{item}));
     movesFail = false;
     world.disk().arm(stuck);
     EXPECT_EQ(world.pass(), ErrorCode::success);
     EXPECT_TRUE(world.names(dead).empty());
-    EXPECT_EQ(world.names("tmp"), (Names{"temp.xxxxxx"}));
     EXPECT_TRUE(world.exists("tmp/temp.xxxxxx/bundle/stuck"));
+    // It is closed, shown, and tried again by this daemon and the next; another's directory there is not ours.
+    world.makeDirectories("tmp/temp.zzzzzz/precious", 0, 0700);
+    for (const bool restarts : {false, true}) {
+        EXPECT_EQ(world.item("tmp/temp.xxxxxx"), directoryOf(0, 0700));
+        EXPECT_EQ(left(), (Names{world.path("tmp/temp.xxxxxx")}));
+        if (restarts)
+            world.restart();
+        EXPECT_EQ(world.pass(), ErrorCode::success);
+    }
+    world.disk().disarm();
+    EXPECT_EQ(world.pass(), ErrorCode::success);
+    EXPECT_EQ(world.names("tmp"), (Names{"temp.zzzzzz"}));
+    EXPECT_TRUE(world.exists("tmp/temp.zzzzzz/precious"));
+    EXPECT_TRUE(left().empty());
+}
+
+// Goal: what ends the removal of one item ends neither the pass nor the daemon. Method: memory runs out for one.
+TEST_F(DeathRow, WantOfMemoryKeepsOneItem) {
+    for (const char* item : {"temp.aaaaaa", "temp.short1", "temp.zzzzzz"})
+        world.makeDirectories(dead + "/" + item);
+    world.disk().arm({.filter = [](const DiskCallInfo& call) -> bool {
+        return call.subject == "temp.short1" ? throw std::bad_alloc() : false;
+    }});
+    EXPECT_EQ(world.pass(), ErrorCode::deathRowItemNotDestroyed);
+    world.disk().disarm();
+    EXPECT_EQ(world.names(dead), (Names{"temp.short1"}));
+    EXPECT_EQ(world.pass(), ErrorCode::success);
+}
+
+/// A world in which mobile's home is a file system of its own.
+class MountedHome {
+public:
+    MountedHome() : mounted_(own_ && ::mount("home", home().c_str(), "tmpfs", 0, "mode=0755,uid=501,gid=501") == 0) {
+        world.load();
+    }
+    ~MountedHome() {
+        if (mounted_)
+            ::umount2(home().c_str(), MNT_DETACH);
+    }
+    MountedHome(const MountedHome&) = delete;
+    MountedHome& operator=(const MountedHome&) = delete;
+    [[nodiscard]] bool mounted() const { return mounted_; }
+
+private:
+    static bool ownMounts() {
+        static const bool own =
+            ::unshare(CLONE_NEWNS) == 0 && ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0;
+        return own;
+    }
+    [[nodiscard]] std::string home() const { return world.path("private/var/mobile"); }
+
+    const bool own_ = ownMounts(); // before the world opens its root
+
+public:
+    World world;
+
+private:
+    const bool mounted_;
+};
+
+const std::string rowOuter = std::string("private/var/mobile/") + fs::deathRowOuter;
+const std::string row = rowOuter + "/" + fs::deathRowInner;
+
+// Goal: a container on another file system goes by a rename, whatever is in it, and is found again after a stop.
+// Method: transient, live and all transient ones at a boot, each with what no copy can make; calls are counted.
+TEST(DeathRowElsewhere, ContainersGoByARename) {
+    MountedHome home;
+    if (!home.mounted())
+        GTEST_SKIP() << "skipped: needs root to mount";
+    World& world = home.world;
+    enum class Way { askedAgain, deleted, boot };
+    for (const Way way : {Way::askedAgain, Way::deleted, Way::boot}) {
+        SCOPED_TRACE(static_cast<int>(way));
+        const FoundContainer container = world.make("app", application, way != Way::deleted);
+        for (int i = 0; i < 300; ++i)
+            ASSERT_EQ(::mkdir((container.path + "/tmp/" + std::to_string(i)).c_str(), 0755), 0);
+        ASSERT_EQ(::mknod((container.path + "/whiteout").c_str(), S_IFCHR, 0), 0);
+        int calls = 0;
+        // A pass may run beside it.
+        world.disk().arm({.filter = [&, here = std::this_thread::get_id()](const DiskCallInfo&) {
+            return std::this_thread::get_id() == here && ++calls == 0;
+        }});
+        if (way == Way::askedAgain)
+            EXPECT_EQ(codeOf(world.daemonsClient().createOrLookupContainerForUser(
+                          mobile, &container.record->identifier(), application, {.transient = true})),
+                      ErrorCode::notFound);
+        else if (way == Way::deleted)
+            EXPECT_TRUE(world.daemonsClient().deleteContainerForUser(mobile, &container.record->identifier(),
+                                                                     application, false));
+        else
+            world.daemonsClient().rebootContainerManagerSetup();
+        world.disk().disarm();
+        EXPECT_LT(calls, 200);
+        EXPECT_FALSE(isThere(container.path));
+        if (way == Way::askedAgain)
+            world.drainDeathRow();
+        else
+            EXPECT_EQ(world.item(rowOuter), directoryOf(0, 0700));
+        world.restart();
+        EXPECT_EQ(world.pass(), ErrorCode::success);
+        EXPECT_FALSE(world.exists(rowOuter));
+        EXPECT_TRUE(world.names(dead).empty());
+    }
+}
+
+// Goal: whatever lies under the row's name, only what the daemon put in is removed. Method: a user's and root's things.
+TEST(DeathRowElsewhere, WhoseNameIsTaken) {
+    MountedHome home;
+    if (!home.mounted())
+        GTEST_SKIP() << "skipped: needs root to mount";
+    World& world = home.world;
+    const std::tuple<std::uint32_t, mode_t, bool> rows[] = {{mobile, 0700, false}, {0, 0755, false}, {0, 0700, true}};
+    for (const auto& [owner, mode, works] : rows) {
+        SCOPED_TRACE(std::to_string(owner) + " " + std::to_string(mode));
+        const std::string app = "app" + std::to_string(owner + mode);
+        (void)world.make(app, application, true);
+        world.makeDirectories(rowOuter + "/precious", 0, 0700);
+        ASSERT_EQ(::chown(world.path(rowOuter).c_str(), owner, owner) | ::chmod(world.path(rowOuter).c_str(), mode), 0);
+        EXPECT_EQ(codeOf(world.create(app, application, true)),
+                  works ? ErrorCode::success : ErrorCode::transientRemovalFailed);
+        EXPECT_EQ(world.pass(), ErrorCode::success);
+        EXPECT_EQ(world.names(rowOuter), Names{"precious"});
+        EXPECT_EQ(world.item(rowOuter), directoryOf(owner, mode));
+        std::filesystem::remove_all(world.path(rowOuter));
+    }
+}
+
+// Goal: another user's directory in a container's place is not taken for it. Method: it lies there before, or is put
+// there just before the move; then the container is asked for or deleted.
+TEST_F(DeathRow, AnothersDirectoryInAContainersPlace) {
+    if (::geteuid() != 0)
+        GTEST_SKIP() << "skipped: only root can give directories away";
+    for (const bool asksAgain : {true, false})
+        for (const bool meanwhile : {false, true}) {
+            SCOPED_TRACE(std::string(asksAgain ? "asked again" : "deleted") + (meanwhile ? " meanwhile" : " before"));
+            const FoundContainer container = world.make("app", application, asksAgain);
+            const std::string& place = container.path;
+            world.makeDirectories("precious", 0, 0700);
+            world.makeDirectories("precious/file");
+            const auto swap = [&] {
+                ASSERT_EQ(::rename(place.c_str(), world.path("aside").c_str()), 0);
+                ASSERT_EQ(::rename(world.path("precious").c_str(), place.c_str()), 0);
+            };
+            bool swapped = !meanwhile;
+            if (!meanwhile)
+                swap();
+            world.disk().arm({.filter = [&](const DiskCallInfo& call) {
+                if (!swapped && call.call == DiskCall::rename && call.subject.starts_with(nameOf(place))) {
+                    swapped = true;
+                    swap();
+                }
+                return false;
+            }});
+            if (asksAgain) {
+                (void)world.create("app", application, true);
+                world.drainDeathRow();
+            } else {
+                (void)world.daemonsClient().stageForDeleteContainersWithUsers(
+                    ZORClientConnection::DeletionBatch::of(mobile, container.uuid, "app", application),
+                    UseLocking::yes);
+            }
+            world.disk().disarm();
+            EXPECT_TRUE(swapped);
+            EXPECT_EQ(world.pass(), ErrorCode::success);
+            EXPECT_TRUE(isThere(place + "/file"));
+            EXPECT_EQ(itemAt(place), directoryOf(0, 0700));
+            std::filesystem::remove_all(place);
+            std::filesystem::remove_all(world.path("aside"));
+            std::filesystem::remove_all(world.path(applications));
+            world.restart();
+            world.load();
+        }
 }
 
 TEST_F(DeathRow, ADeathRowThatIsNoDirectory) {

@@ -1,10 +1,13 @@
 // SPDX-License-Identifier: Apache-2.0
 // The setup of a launch and of a boot: what counts as orphaned, what is swept, who is skipped; and the sandbox
 // mappings.
+#include "daemon/Daemon.h"
 #include "world/World.h"
 
+#include <algorithm>
 #include <filesystem>
 #include <gtest/gtest.h>
+#include <new>
 #include <set>
 #include <unistd.h>
 
@@ -173,6 +176,41 @@ TEST(Setup, BootAndLaunch) {
     EXPECT_FALSE(world.exists("private/var/nowhere"));
     for (const LogLine& line : world.log.take())
         EXPECT_FALSE(line.message.starts_with("Failed to delete")) << line;
+}
+
+// Goal: a pass that fails ends alone, and a daemon that is to end stops between items and leaves the rest, and the
+// boot, to the next. Method: memory runs out once; a stop wanted after each number of looks.
+TEST(Setup, EndsWithOnePassOrWhenItIsToldTo) {
+    World world;
+    bool thrown = false;
+    world.load();
+    world.makeDirectories(applications + "/Junk");
+    world.disk().arm({.filter = [&](const support::DiskCallInfo& call) -> bool {
+        if (thrown || call.call != support::DiskCall::rename)
+            return false;
+        thrown = true;
+        throw std::bad_alloc();
+    }});
+    world.boot();
+    world.disk().disarm();
+    EXPECT_TRUE(thrown);
+    const auto& passes = world.services().store().setup.passes();
+    EXPECT_EQ(std::ranges::count_if(passes, [](const auto& pass) { return pass.failed; }), 1);
+    EXPECT_FALSE(world.exists(applications + "/Junk"));
+    int looks = 0;
+    for (int allowed = 0; !world.bootMarker.state.present; ++allowed) {
+        ASSERT_LT(allowed, 200);
+        world.restart();
+        for (const char* junk : {"/Junk1", "/Junk2"})
+            world.makeDirectories(applications + junk);
+        int progress = 0;
+        looks = 0;
+        Daemon(world.services(), {.settingUp = [&] { ++progress; }, .stopWanted = [&] { return looks++ == allowed; }})
+            .setUp();
+        EXPECT_EQ(progress, 1);
+        EXPECT_EQ(world.services().store().setup.stopped(), looks > allowed);
+    }
+    EXPECT_GT(looks, 10);
 }
 
 // Goal: no failure stops a setup. Method: a disk on which no move succeeds; every step says so and the rest runs.

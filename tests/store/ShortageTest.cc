@@ -106,6 +106,7 @@ TEST_F(Shortage, ALimitThatComesAndGoes) {
 // Goal: a size that was measured in part is not kept. Method: each number of descriptors left, then all.
 TEST_F(Shortage, ASizeMeasuredInPartIsNotKept) {
     int inPart = 0;
+    world.services().store().usageSettledTime = {};
     for (rlim_t left = 0; left < descriptorsMax; ++left) {
         SCOPED_TRACE(left);
         const FoundContainer bundle = world.make("size" + std::to_string(left), ContainerClass::bundleApplication);

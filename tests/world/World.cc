@@ -215,6 +215,10 @@ std::vector<std::string> World::deathRow() const {
 void World::putContainer(std::string_view relative, const plist::Dictionary& metadata) const {
     makeDirectories(relative);
     write(std::string(relative) + "/" + names::metadataFile, binary(metadata));
+    const plist::Value* const user = metadata.find("ZORMetadataPersona");
+    const uid_t owner = user ? static_cast<uid_t>(user->asUnsigned().value_or(0)) : 0;
+    if (owner > 500 && ::geteuid() == 0)
+        require(::chown(path(relative).c_str(), owner, owner) == 0, "chown");
 }
 
 void World::refuse(support::DiskCall call, int error, support::FaultSpan span) {

@@ -6,6 +6,7 @@
 #include <fcntl.h>
 #include <linux/openat2.h>
 #include <string_view>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
@@ -61,6 +62,15 @@ std::expected<FileDescriptor, int> openBeneathRemembered(int directory, const ch
 
 std::expected<FileDescriptor, int> openInRoot(int directory, const char* relativePath, int flags) {
     return resolve(directory, relativePath, flags, 0, RESOLVE_IN_ROOT | RESOLVE_NO_MAGICLINKS);
+}
+
+std::expected<std::uint64_t, int> mountIdOf(int fd) {
+    struct statx status{};
+    if (::statx(fd, "", AT_EMPTY_PATH | AT_STATX_DONT_SYNC | AT_NO_AUTOMOUNT, STATX_MNT_ID, &status) != 0)
+        return std::unexpected(errno);
+    if ((status.stx_mask & STATX_MNT_ID) == 0)
+        return std::unexpected(ENOSYS);
+    return status.stx_mnt_id;
 }
 
 } // namespace zor::platform

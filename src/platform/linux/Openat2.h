@@ -5,6 +5,7 @@
 
 #include "platform/FileDescriptor.h"
 
+#include <cstdint>
 #include <expected>
 #include <sys/types.h>
 
@@ -27,5 +28,8 @@ namespace zor::platform {
 /// The same as openBeneath for trees that only root writes to, such as DIR/etc: links are followed, as if `directory`
 /// were "/".
 [[nodiscard]] std::expected<FileDescriptor, int> openInRoot(int directory, const char* relativePath, int flags);
+
+/// The number of the mount that an open file lies on. Asks its file system nothing; errno on failure.
+[[nodiscard]] std::expected<std::uint64_t, int> mountIdOf(int fd);
 
 } // namespace zor::platform

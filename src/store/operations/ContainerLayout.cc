@@ -30,4 +30,9 @@ ContainerLayout layoutOf(ContainerClass containerClass, std::uint32_t userId) {
     return layout;
 }
 
+std::optional<std::uint32_t> topLevelOwnerOf(ContainerClass containerClass, std::uint32_t userId) {
+    const std::uint32_t owner = layoutOf(containerClass, userId).topLevelOwner;
+    return owner == ownerUnchanged ? std::nullopt : std::optional(owner);
+}
+
 } // namespace zor

@@ -6,6 +6,7 @@
 #include "daemon/base/UserIdentity.h"
 #include "fs/ZORFileManager.h"
 
+#include <optional>
 #include <span>
 
 namespace zor {
@@ -22,5 +23,8 @@ struct ContainerLayout {
 
 /// The layout of a valid class for a container of `userId`.
 [[nodiscard]] ContainerLayout layoutOf(ContainerClass containerClass, std::uint32_t userId);
+
+/// The user whose a container's directory is. Absent: nobody but root can put anything in its place.
+[[nodiscard]] std::optional<std::uint32_t> topLevelOwnerOf(ContainerClass containerClass, std::uint32_t userId);
 
 } // namespace zor

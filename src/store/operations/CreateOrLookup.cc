@@ -19,6 +19,7 @@
 #include "platform/BlockingScope.h"
 #include "store/StoreServices.h"
 #include "store/operations/ContainerBuilder.h"
+#include "store/operations/ContainerLayout.h"
 
 #include <cerrno>
 
@@ -123,8 +124,10 @@ Result<void> ZORClientConnection::checkShare(std::uint32_t userId, const std::st
 
 Result<void> ZORClientConnection::discardTransient(const ZORMetadata& record, const std::string& identifier) {
     const FileURL url = record.url();
-    const auto moved = _moveItemAtURLToDeathRow(url, StartDeletionThread::yes);
-    if (!moved)
+    const auto moved =
+        _moveItemAtURLToDeathRow(url, StartDeletionThread::yes, topLevelOwnerOf(record.containerClass(), record.uid()));
+    // Where another's directory is in its place, the container is gone.
+    if (!moved && !(moved.error().underlying() && moved.error().underlying()->isPosix(notTheContainer)))
         return makeError(services_.log, {"createOrLookupContainerForUser", __LINE__}, ErrorCode::transientRemovalFailed,
                          &moved.error(), LogFlag::yes, "Failed to remove transient container at %s", url.c_str());
     // With its directory gone the record would answer "no metadata" for this identifier until the daemon ends, should

@@ -1,37 +1,64 @@
 // SPDX-License-Identifier: Apache-2.0
-// Death row: where everything goes that is to be deleted, and the passes that delete it later.
+// Death row: where everything goes that is to be deleted.
 //
-// A move here is one rename on the caller's thread, usually under the locks of its operation; the item gets a unique
-// directory of its own, so names never collide. Passes run one after another on the death-row queue and take no lock:
-// what is on death row belongs to no container. A stop at any point leaves items, or empty unique directories, for the
-// next pass; the launch queues one. What a power cut leaves is the same: nothing is removed whose move here could still
-// be undone.
+// A move here is one rename on the caller's thread, usually under the locks of its operation; the item gets a name of
+// its own, so names never collide. What lies on another file system than root's death row goes to a death row there
+// (fs/FileSystemDeathRow.h): nothing is ever copied to get out of the way. Passes (DeletionPass.cc) delete it later;
+// what is on death row belongs to no container. A stop at any point leaves items, or empty directories of theirs, for
+// the next pass; the launch queues one.
+//
+// Whoever owns the directory that holds a container can put a directory of another user's in its place. So it is asked
+// before the move whose the directory is, and again when it has come to death row, where nobody can change it any more:
+// another's goes back. A pass waits for that: it takes no item while one is being moved.
 #include "daemon/ZORClientConnection.h"
+#include "fs/AtomicFile.h"
+#include "fs/FileSystemDeathRow.h"
+#include "platform/linux/Openat2.h"
 #include "store/StoreServices.h"
 
 #include <cerrno>
+#include <cstdio>
+#include <fcntl.h>
+#include <unistd.h>
 
 namespace zor {
 
 namespace {
 
-/// A pass may take the fresh directory for rubbish before the item is in it. That is rare; that often in a row it is no
-/// accident.
-constexpr int uniqueDirectoriesTriedMax = 16;
+constexpr const char* moveFunction = "_moveItemAtURLToDeathRow";
+/// Somebody may remove the fresh directory before the item is in it. That often in a row it is no accident.
+constexpr int directoriesTriedMax = 16;
+
+bool isMissing(int directory, const FileURL& url) {
+    const auto item =
+        platform::openBeneathOnMount(directory, std::string(url.lastPathComponent()).c_str(), O_PATH | O_NOFOLLOW);
+    return !item && item.error() == ENOENT;
+}
+
+/// A directory of another user's. Anything else in a container's place its owner may remove anyway. Without root's
+/// power all is the daemon's.
+bool isAnothers(const struct stat& status, std::uint32_t owner) {
+    return ::geteuid() == 0 && S_ISDIR(status.st_mode) && status.st_uid != owner;
+}
 
 } // namespace
 
-Result<void> ZORClientConnection::_moveItemAtURLToDeathRow(const FileURL& url,
-                                                           StartDeletionThread startDeletionThread) {
+Result<void> ZORClientConnection::_moveItemAtURLToDeathRow(const FileURL& url, StartDeletionThread startDeletionThread,
+                                                           std::optional<std::uint32_t> owner) {
     ZORFileManager& fileManager = services_.fileManager;
+    const FileURL deathRow = services_.configuration.deathrowDirectory();
     for (int tried = 0;; ++tried) {
-        const auto unique =
-            fileManager.createTemporaryDirectoryInDirectoryURL(services_.configuration.deathrowDirectory());
+        const auto unique = fileManager.createTemporaryDirectoryInDirectoryURL(deathRow);
         if (!unique)
-            return makeError(services_.log, ZOR_HERE, ErrorCode::moveToDeathRowFailed, &unique.error(), LogFlag::yes,
-                             "Failed to create unique directory at: %s", url.c_str());
+            return makeError(services_.log, {moveFunction, __LINE__}, ErrorCode::moveToDeathRowFailed, &unique.error(),
+                             LogFlag::yes, "Failed to create unique directory at: %s", url.c_str());
         const FileURL destination = unique->appendingDirectory(url.lastPathComponent());
-        const auto moved = fileManager.moveItemAtURL(url, destination);
+        const auto moved = [&] {
+            const platform::MutexLock moving(services_.deathRow.moving);
+            return condemn(url, destination, owner, moving);
+        }();
+        if (moved && *moved == DeathRow::ofFileSystem)
+            (void)fileManager.removeItemAtURL(*unique);
         if (moved) {
             if (startDeletionThread == StartDeletionThread::yes)
                 deleteContainersOnDeathRowWithCompletion(nullptr);
@@ -42,88 +69,102 @@ Result<void> ZORClientConnection::_moveItemAtURLToDeathRow(const FileURL& url,
         const bool somethingMissing = moved.error().isPosix(ENOENT);
         if (somethingMissing && fileManager.itemDoesNotExistAtURL(url))
             return {};
-        if (somethingMissing && fileManager.itemDoesNotExistAtURL(*unique) && tried < uniqueDirectoriesTriedMax)
+        if (somethingMissing && fileManager.itemDoesNotExistAtURL(*unique) && tried < directoriesTriedMax)
             continue;
-        return makeError(services_.log, ZOR_HERE, ErrorCode::moveToDeathRowFailed, &moved.error(), LogFlag::yes,
-                         "Failed to move item at: %s to: %s", url.c_str(), destination.c_str());
+        return makeError(services_.log, {moveFunction, __LINE__}, ErrorCode::moveToDeathRowFailed, &moved.error(),
+                         LogFlag::yes, "Failed to move item at: %s to: %s", url.c_str(), destination.c_str());
     }
 }
 
-void ZORClientConnection::deleteContainersOnDeathRowWithCompletion(std::function<void(ErrorCode)> completion) {
-    // A pass that has not begun finds what comes until then: only who wants to be told of its end needs another. Else
-    // whoever sends something here over and over would queue passes without end, each of which keeps the daemon busy.
-    std::atomic<bool>& waits = services_.deletionPassWaits;
-    const bool isAwaited = completion != nullptr;
-    if (!isAwaited && waits.exchange(true))
-        return;
-    try {
-        ZORDispatchAsyncWithTransaction(services_.transactions, services_.deathRowQueue,
-                                        [self = shared_from_this(), completion = std::move(completion), isAwaited] {
-                                            if (!isAwaited)
-                                                self->services_.deletionPassWaits = false;
-                                            self->runDeletionPass(completion);
-                                        });
-    } catch (...) {
-        if (!isAwaited)
-            waits = false;
-        throw;
+Result<ZORClientConnection::DeathRow> ZORClientConnection::condemn(const FileURL& url, const FileURL& destination,
+                                                                   std::optional<std::uint32_t> owner,
+                                                                   const platform::MutexLock& /*moving*/) {
+    const auto from = services_.fileManager.resolver().openParent(url);
+    const auto to = services_.fileManager.resolver().openParent(destination);
+    if (!from || !to) {
+        const int number = from ? to.error() : from.error();
+        return posixError({moveFunction, __LINE__}, number, "open of %s failed: %s",
+                          (from ? destination : url).deletingLastPathComponent().c_str(), errorText(number));
+    }
+    if (owner)
+        TRY(judgeOwner(from->directory.get(), url, *owner));
+    const auto renamed = services_.fileManager.renameItem(from->directory.get(), url, to->directory.get(), destination);
+    if (!renamed && renamed.error().isPosix(EXDEV)) {
+        TRY(condemnOnItsFileSystem(from->directory.get(), url, owner));
+        return DeathRow::ofFileSystem;
+    }
+    TRY(renamed);
+    if (owner)
+        TRY(putBackIfAnothers(from->directory.get(), url, to->directory.get(), destination, *owner));
+    return DeathRow::ofRoot;
+}
+
+Result<void> ZORClientConnection::condemnOnItsFileSystem(int from, const FileURL& url,
+                                                         std::optional<std::uint32_t> owner) {
+    ZORFileManager& fileManager = services_.fileManager;
+    const auto failed = [&](const FileURL& row, int number) {
+        return posixError({moveFunction, __LINE__}, number, "death row %s cannot be used: %s", row.c_str(),
+                          errorText(number));
+    };
+    const auto top = fs::topOfMount(fileManager.resolver(), url.deletingLastPathComponent());
+    if (!top)
+        return failed(url.deletingLastPathComponent(), top.error());
+    const FileURL row = fs::deathRowBelow(top->url);
+    for (int tried = 0;; ++tried) {
+        const auto opened = fs::openOrMakeDeathRow(fileManager.disk(), top->directory.get());
+        // Its owner may have renamed the directory that holds the row.
+        const bool again = tried < directoriesTriedMax && !isMissing(from, url);
+        if (!opened && opened.error() == ENOENT && again)
+            continue;
+        if (!opened)
+            return failed(row, opened.error());
+        const FileURL destination = row.appendingDirectory(fs::uniqueName("temp."));
+        const auto renamed = fileManager.renameItem(from, url, opened->get(), destination);
+        if (!renamed && renamed.error().isPosix(ENOENT) && again)
+            continue;
+        TRY(renamed);
+        return owner ? putBackIfAnothers(from, url, opened->get(), destination, *owner) : Result<void>();
     }
 }
 
-void ZORClientConnection::runDeletionPass(const std::function<void(ErrorCode)>& completion) {
-    const auto passed =
-        services_.boundary.run({"deleteContainersOnDeathRowWithCompletion", __LINE__}, [&]() -> Result<void> {
-            if (auto error = deleteEverythingOnDeathRow())
-                return std::move(*error);
-            return {};
-        });
-    if (completion)
-        completion(passed ? ErrorCode::success : passed.error().replyCode());
-}
-
-std::optional<ZORError> ZORClientConnection::deleteEverythingOnDeathRow() {
-    constexpr Here here{"deleteContainersOnDeathRowWithCompletion", __LINE__};
-    const FileURL deathRow = services_.configuration.deathrowDirectory();
-    auto items = services_.fileManager.urlsForItemsInDirectoryAtURL(deathRow);
-    if (!items && items.error().isPosix(ENOENT))
-        return std::move(items).error();
-    if (!items)
-        return makeError(services_.log, here, ErrorCode::listForDeletionFailed, &items.error(), LogFlag::yes,
-                         "Failed to get items for deletion: %s : %s", deathRow.c_str(), items.error().text().c_str());
-    for (FileURL& leftover : services_.fileManager.copyLeftoversInDirectoryAtURL(deathRow))
-        items->push_back(std::move(leftover));
-    if (items->empty())
-        return std::nullopt;
-    // Where nothing keeps the order of changes, a power cut could else bring back a container that is half removed.
-    const auto opened = services_.fileManager.resolver().openDirectory(deathRow);
-    const int status = opened ? services_.durability.beforeRemoval(opened->get()) : -opened.error();
-    if (status < 0) {
-        const ZORError cause = posixError(here, -status, "sync of %s failed: %s", deathRow.c_str(), errorText(-status));
-        return makeError(services_.log, here, ErrorCode::listForDeletionFailed, &cause, LogFlag::yes,
-                         "Failed to get items for deletion: %s : %s", deathRow.c_str(), cause.text().c_str());
+Result<void> ZORClientConnection::judgeOwner(int directory, const FileURL& url, std::uint32_t owner) {
+    const auto item =
+        platform::openBeneathOnMount(directory, std::string(url.lastPathComponent()).c_str(), O_PATH | O_NOFOLLOW);
+    struct stat status{};
+    if (!item || ::fstat(item->get(), &status) != 0) {
+        const int number = item ? errno : item.error() == EXDEV ? EBUSY : item.error();
+        return posixError({moveFunction, __LINE__}, number, "open of %s failed: %s", url.c_str(), errorText(number));
     }
-    std::optional<ZORError> last;
-    for (const FileURL& item : *items) {
-        const auto removed = _removeItemOrMoveToTempAtURL(item);
-        if (!removed)
-            last = makeError(services_.log, here, ErrorCode::deathRowItemNotDestroyed, &removed.error(), LogFlag::yes,
-                             "Failed to destroy item at: %s", item.c_str());
-    }
-    return last;
-}
-
-Result<void> ZORClientConnection::_removeItemOrMoveToTempAtURL(const FileURL& url) {
-    const auto removed = services_.fileManager.removeItemAtURL(url);
-    if (removed || removed.error().isPosix(ENOENT))
+    // A power cut may have kept a directory that the daemon made and lost who was to own it. An empty one is nobody's
+    // loss.
+    const bool isHalfMade = status.st_uid == ::geteuid() && S_ISDIR(status.st_mode);
+    if (!isAnothers(status, owner) || (isHalfMade && services_.fileManager.disk().removeDirectory(
+                                                         directory, std::string(url.lastPathComponent()).c_str()) == 0))
         return {};
-    ZOR_LOG(services_.log, logLevelDebug, "Couldn't remove, so moving item to /tmp: %s : %s", url.c_str(),
-            removed.error().text().c_str());
-    const FileURL temporary = services_.configuration.temporaryDirectory();
-    const auto moved = services_.fileManager.moveItemAtURL(url, temporary.appendingDirectory(url.lastPathComponent()));
-    if (moved)
+    return posixError({moveFunction, __LINE__}, notTheContainer,
+                      "%s belongs to user %u: it is not the container, which is user %u's", url.c_str(), status.st_uid,
+                      owner);
+}
+
+Result<void> ZORClientConnection::putBackIfAnothers(int from, const FileURL& url, int to, const FileURL& destination,
+                                                    std::uint32_t owner) {
+    const std::string name(destination.lastPathComponent());
+    struct stat status{};
+    if (::fstatat(to, name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0 || !isAnothers(status, owner))
         return {};
-    return makeError(services_.log, ZOR_HERE, ErrorCode::moveToTemporaryFailed, &moved.error(), LogFlag::yes,
-                     "Failed to move dir: %s to: %s", url.c_str(), temporary.c_str());
+    platform::Disk& disk = services_.fileManager.disk();
+    const std::string before(url.lastPathComponent());
+    // Its place may have been taken meanwhile.
+    std::string back = before;
+    int renamed = disk.rename(to, name.c_str(), from, back.c_str(), RENAME_NOREPLACE);
+    if (renamed < 0) {
+        back = fs::uniqueName(before + ".");
+        renamed = disk.rename(to, name.c_str(), from, back.c_str(), 0);
+    }
+    services_.log.write(logLevelError, moveFunction, "A directory of user %u was put in the place of %s; %s %s%s%s",
+                        status.st_uid, url.c_str(), renamed == 0 ? "it is back as" : "it could not be put back as",
+                        ZOR_SHOWN(back), renamed == 0 ? "" : ": ", renamed == 0 ? "" : errorText(-renamed));
+    return posixError({moveFunction, __LINE__}, notTheContainer, "%s was swapped while it was taken away", url.c_str());
 }
 
 } // namespace zor

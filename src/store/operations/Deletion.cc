@@ -12,6 +12,7 @@
 #include "entitlements/ZOREntitlementMapping.h"
 #include "platform/BlockingScope.h"
 #include "store/StoreServices.h"
+#include "store/operations/ContainerLayout.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -101,7 +102,7 @@ Result<void> ZORClientConnection::stageForDelete(const DeletionBatch& batch, std
     const bool transient = record->transient();
     if (isBundleClass(containerClass) && !transient)
         services_.entitlements.removeEntitlementDictionariesForIdentifierAndItsChildren(*identifier);
-    if (!takeAwayForDelete(record->url(), changed))
+    if (!takeAwayForDelete(record->url(), topLevelOwnerOf(record->containerClass(), record->uid()), changed))
         return {};
     if (isPerUserClass(containerClass) && !transient &&
         !_setSandboxContainerMappingForUser(userId, *identifier, containerClass, std::nullopt))
@@ -115,12 +116,17 @@ Result<void> ZORClientConnection::stageForDelete(const DeletionBatch& batch, std
     return {};
 }
 
-bool ZORClientConnection::takeAwayForDelete(const FileURL& container, std::vector<FileURL>& changed) {
+bool ZORClientConnection::takeAwayForDelete(const FileURL& container, std::optional<std::uint32_t> owner,
+                                            std::vector<FileURL>& changed) {
     const FileURL deathRow = services_.configuration.deathrowDirectory();
     const FileURL destination = deathRow.appendingDirectory(container.lastPathComponent());
-    const auto moved = moveAwayForDelete(container, destination);
+    const auto moved = [&] {
+        const platform::MutexLock moving(services_.deathRow.moving);
+        return condemn(container, destination, owner, moving);
+    }();
     if (moved) {
-        changed.push_back(deathRow);
+        // On its own file system the move is on the disk with the directory that it left.
+        changed.push_back(*moved == DeathRow::ofRoot ? deathRow : container.deletingLastPathComponent());
         return true;
     }
     ZOR_LOG(services_.log, logLevelDebug, "Couldn't stage for deletion from %s to %s: %s", container.c_str(),
@@ -128,12 +134,14 @@ bool ZORClientConnection::takeAwayForDelete(const FileURL& container, std::vecto
     // An earlier container of a well-known name may still wait on death row under that name. This one goes beside it: a
     // stop while it is removed in place would leave half of it under the name it has.
     const bool nameIsTaken = moved.error().isPosix(ENOTEMPTY) || moved.error().isPosix(EEXIST);
-    if (nameIsTaken && _moveItemAtURLToDeathRow(container, StartDeletionThread::no)) {
+    if (nameIsTaken && _moveItemAtURLToDeathRow(container, StartDeletionThread::no, owner)) {
         changed.push_back(deathRow);
         return true;
     }
-    // What stopped the move would stop the removal too, half-way: then it stays whole.
-    const auto removed = moved.error().isOwnShortage() ? moved : services_.fileManager.removeItemAtURL(container);
+    // What stopped the move would stop the removal too, half-way; and another's directory is not ours to remove. Then
+    // it stays whole.
+    const bool stays = moved.error().isOwnShortage() || moved.error().isPosix(notTheContainer);
+    const auto removed = stays ? Result<void>(moved.error()) : services_.fileManager.removeItemAtURL(container);
     if (!removed) {
         makeError(services_.log, {stageFunction, __LINE__}, ErrorCode::listForDeletionFailed, &removed.error(),
                   LogFlag::yes, "Failed to delete container at %s: %s", container.c_str(),
@@ -142,23 +150,6 @@ bool ZORClientConnection::takeAwayForDelete(const FileURL& container, std::vecto
     }
     changed.push_back(container.deletingLastPathComponent());
     return true;
-}
-
-Result<void> ZORClientConnection::moveAwayForDelete(const FileURL& container, const FileURL& destination) {
-    ZORFileManager& fileManager = services_.fileManager;
-    const auto from = fileManager.resolver().openParent(container);
-    const auto to = fileManager.resolver().openParent(destination);
-    if (!from || !to) {
-        const int number = from ? to.error() : from.error();
-        return posixError(ZOR_HERE, number, "open of %s failed: %s", (from ? destination : container).c_str(),
-                          errorText(number));
-    }
-    const auto moved = TRY(fileManager.moveItem(from->directory.get(), container, to->directory.get(), destination));
-    // A copy does not fail when only the source cannot go: it would be found again. After a move by name, what lies
-    // there is the owner's next tree, and none of ours.
-    if (moved == ZORFileManager::Moved::byCopy && !fileManager.itemDoesNotExistAtURL(container))
-        return posixError(ZOR_HERE, EBUSY, "%s is still there", container.c_str());
-    return {};
 }
 
 std::optional<ZORError> ZORClientConnection::syncDirectories(std::vector<FileURL> changed) {

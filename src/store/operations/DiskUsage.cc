@@ -2,6 +2,10 @@
 // How many bytes a container takes. What a live bundle takes is measured once and kept with its info, since its content
 // does not change; everything else is measured each time. A transient bundle is being filled.
 //
+// A bundle that is being filled is measured too, but not kept: nothing of what was walked may have changed within
+// usageSettledTime before the walk, or in it. What is not seen: a fill that pauses for longer than that, and one that
+// begins during the walk in what was walked before, below the container's own directory.
+//
 // The walk holds no lock: a lookup waits for every identifier lock, so a large container would stop all clients for as
 // long as it is walked. The container is looked up and opened under its lock, and walked on that descriptor; the result
 // is kept only if the lock, taken again, finds the same container at the same place.
@@ -78,11 +82,13 @@ Result<std::uint64_t> ZORClientConnection::diskUsage(const ContainerAddress& add
                              ZORGlobalConfiguration::ownerOfClassDirectory(address.containerClass, address.userId)))
             directory = std::unexpected(EPERM);
     }
+    const auto begin = std::chrono::system_clock::now();
     const fs::Usage usage = [&] {
         const platform::BlockingScope blocking; // a large tree must not take one of the few threads from all clients
         return services_.fileManager.diskUsageOfDirectory(directory, container);
     }();
-    if (isKept && !usage.cutShort)
+    const bool settled = usage.lastChange + services_.usageSettledTime <= begin;
+    if (isKept && !usage.cutShort && settled)
         keepDiskUsage(address, container, usage.bytes);
     return usage.bytes;
 }

@@ -4,6 +4,8 @@
 // Runs on the thread that starts the daemon, alone; only the entitlement and group passes take identifier locks, for
 // what they clear and delete. Neither setup fails: what goes wrong is logged and the next step runs. Every step may be
 // repeated, so a stop anywhere is mended by the next launch: the boot's work is marked as done only when all of it ran.
+// A daemon that is told to end stops between two items. Directories are read in batches: no number of entries is too
+// large for the memory.
 #include "daemon/ZORClientConnection.h"
 #include "daemon/base/UserIdentity.h"
 #include "entitlements/ZOREntitlementMapping.h"
@@ -18,6 +20,7 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
+#include <utility>
 #include <vector>
 
 namespace zor {
@@ -30,6 +33,8 @@ constexpr std::array orphanReportHead = {
 };
 constexpr const char* launchFunction = "containerManagerSetup";
 constexpr const char* rebootFunction = "rebootContainerManagerSetup";
+/// So many entries of a class directory are judged at once: enough for several threads, little enough for any memory.
+constexpr std::size_t orphanBatchMax = 1024;
 constexpr const char* orphanReportEnd = "***END INTERNAL BUILD REQUEST";
 
 template <typename Function>
@@ -55,8 +60,10 @@ void ZORClientConnection::rebootContainerManagerSetup() {
     report.run("bundle migration", [this] { return migrateBundles(); });
     report.run("well-known migration", [this] { return migrateWellknown(); });
     report.run("shared transient containers", [this] {
-        std::uint64_t moved = discardAtBoot(services_.configuration.transientDirectory(), "shared transient");
-        moved += discardAtBoot(services_.configuration.transientBundleDirectory(), "shared transient bundle");
+        std::uint64_t moved =
+            discardAtBoot(services_.configuration.transientDirectory(), "shared transient", std::nullopt);
+        moved += discardAtBoot(services_.configuration.transientBundleDirectory(), "shared transient bundle",
+                               bundleOwnerUserId);
         return moved;
     });
     report.run("group identifiers of data containers",
@@ -97,10 +104,11 @@ std::uint64_t ZORClientConnection::migrateWellknown() {
     return outcome.migrated;
 }
 
-std::uint64_t ZORClientConnection::discardAtBoot(const std::optional<FileURL>& url, const char* what) {
+std::uint64_t ZORClientConnection::discardAtBoot(const std::optional<FileURL>& url, const char* what,
+                                                 std::optional<std::uint32_t> owner) {
     if (!url)
         return 0;
-    const auto moved = _moveItemAtURLToDeathRow(*url, StartDeletionThread::no);
+    const auto moved = _moveItemAtURLToDeathRow(*url, StartDeletionThread::no, owner);
     if (!moved)
         services_.log.write(logLevelError, rebootFunction, "Failed to delete %s URL %s : %s", what, url->c_str(),
                             moved.error().text().c_str());
@@ -119,7 +127,9 @@ std::uint64_t ZORClientConnection::cleanUpUsers() {
         ZORPerUserConfiguration* user = services_.configuration.getPerUserConfigurationForUserId(userId);
         if (!user || !user->existsUserBaseDirectory())
             continue;
-        removed += discardAtBoot(user->transientDirectory(), "per-user transient");
+        if (!services_.setup.goOn())
+            break;
+        removed += discardAtBoot(user->transientDirectory(), "per-user transient", userId);
         forEachClass(isUserClass, [&](ContainerClass containerClass) {
             removed += _cleanupOrphanedDataForUser(userId, containerClass);
         });
@@ -159,52 +169,64 @@ std::uint64_t ZORClientConnection::_cleanupOrphanedDataForUser(std::uint32_t use
     // What another's directory holds there is no orphan; the getter has said so.
     if (!directory || !directory->opened)
         return 0;
-    const auto entries = services_.fileManager.urlsForItemsInDirectoryAtURL(directory->url);
-    if (!entries) {
-        if (!entries.error().isPosix(ENOENT))
-            services_.log.write(logLevelError, __func__, "Failed to get items at %s : %s", directory->url.c_str(),
-                                entries.error().text().c_str());
-        return 0;
-    }
-    std::vector<Orphan> kinds(entries->size());
+    std::uint64_t removed = 0;
+    std::vector<FileURL> batch;
+    const auto listed = services_.fileManager.forEachItemInDirectoryAtURL(
+        directory->url, ZORFileManager::Leftovers::hidden, [&](int, const FileURL& entry) {
+            batch.push_back(entry);
+            if (batch.size() == orphanBatchMax)
+                removed += removeOrphans(directory->opened->get(), std::exchange(batch, {}), containerClass);
+            return services_.setup.goOn();
+        });
+    if (!listed && !listed.error().isPosix(ENOENT))
+        services_.log.write(logLevelError, __func__, "Failed to get items at %s : %s", directory->url.c_str(),
+                            listed.error().text().c_str());
+    if (!listed || services_.setup.stopped())
+        return removed;
+    removed += removeOrphans(directory->opened->get(), batch, containerClass);
+    discardCopyLeftovers(directory->url);
+    return removed;
+}
+
+std::uint64_t ZORClientConnection::removeOrphans(int classDirectory, const std::vector<FileURL>& entries,
+                                                 ContainerClass containerClass) {
+    constexpr const char* function = "_cleanupOrphanedDataForUser";
+    std::vector<Orphan> kinds(entries.size());
     fs::forEachStretch(kinds.size(), [&](std::size_t begin, std::size_t end) {
         for (std::size_t i = begin; i < end; ++i)
-            kinds[i] = orphanKind(directory->opened->get(), (*entries)[i], containerClass);
+            kinds[i] = orphanKind(classDirectory, entries[i], containerClass);
     });
     std::uint64_t removed = 0;
-    for (std::size_t i = 0; i < kinds.size(); ++i) {
-        const FileURL& entry = (*entries)[i];
+    for (std::size_t i = 0; i < kinds.size() && services_.setup.goOn(); ++i) {
+        const FileURL& entry = entries[i];
         if (kinds[i] == Orphan::no)
             continue;
         if (kinds[i] == Orphan::noMetadata)
-            services_.log.write(logLevelError, __func__, "Deleting orphaned data missing a metadata file at: %s",
+            services_.log.write(logLevelError, function, "Deleting orphaned data missing a metadata file at: %s",
                                 entry.c_str());
         if (services_.internalBuild.isInternalBuild())
             reportOrphan(entry);
         // A failure has been logged where it happened; the next boot tries again.
         removed += _moveItemAtURLToDeathRow(entry, StartDeletionThread::no) ? 1 : 0;
     }
-    discardCopyLeftovers(directory->url);
     return removed;
 }
 
 std::uint64_t ZORClientConnection::sweepStaging() {
     const FileURL staging = services_.configuration.stagingDirectory();
-    const auto entries = services_.fileManager.urlsForItemsInDirectoryAtURL(staging);
-    if (!entries) {
-        if (!entries.error().isPosix(ENOENT))
-            services_.log.write(logLevelError, launchFunction, "Failed to get items at staging URL%s : %s",
-                                staging.c_str(), entries.error().text().c_str());
-        return 0;
-    }
     const auto kept = stagedByJournals();
     if (!kept)
         return 0;
     std::uint64_t swept = 0;
-    for (const FileURL& entry : *entries)
-        if (!kept->contains(entry.lastPathComponent()))
-            swept += _moveItemAtURLToDeathRow(entry, StartDeletionThread::no) ? 1 : 0;
-    discardCopyLeftovers(staging);
+    const auto listed = services_.fileManager.forEachItemInDirectoryAtURL(
+        staging, ZORFileManager::Leftovers::shown, [&](int, const FileURL& entry) {
+            if (!kept->contains(entry.lastPathComponent()))
+                swept += _moveItemAtURLToDeathRow(entry, StartDeletionThread::no) ? 1 : 0;
+            return services_.setup.goOn();
+        });
+    if (!listed && !listed.error().isPosix(ENOENT))
+        services_.log.write(logLevelError, launchFunction, "Failed to get items at staging URL%s : %s", staging.c_str(),
+                            listed.error().text().c_str());
     return swept;
 }
 
@@ -253,6 +275,8 @@ void ZORClientConnection::containerManagerSetup() {
         return static_cast<std::uint64_t>(journals - std::min(journals, journalCount()));
     });
     report.run("staging sweep", [this] { return sweepStaging(); });
+    if (report.stopped())
+        return;
     deleteContainersOnDeathRowWithCompletion(nullptr);
     // A stop between the move of a container and its mapping leaves a mapping that points to nothing.
     report.run("dangling mappings", [this] {

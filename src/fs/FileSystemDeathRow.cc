@@ -1,0 +1,91 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "fs/FileSystemDeathRow.h"
+
+#include "fs/LeftoverNames.h"
+#include "platform/linux/Openat2.h"
+
+#include <cerrno>
+#include <fcntl.h>
+#include <unistd.h>
+
+namespace zor::fs {
+
+namespace {
+
+constexpr mode_t closedMode = 0700;
+
+/// A directory of the daemon's own that nobody else may enter.
+OpenResult openClosed(int parent, const char* name) {
+    auto opened = platform::openBeneathOnMount(parent, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
+    if (!opened && (opened.error() == ENOTDIR || opened.error() == ELOOP || opened.error() == EXDEV))
+        return std::unexpected(EPERM);
+    if (!opened)
+        return opened;
+    struct stat status{};
+    if (::fstat(opened->get(), &status) != 0)
+        return std::unexpected(errno);
+    if (status.st_uid != ::geteuid() || (status.st_mode & 0777) != closedMode)
+        return std::unexpected(EPERM);
+    return opened;
+}
+
+int makeIfMissing(platform::Disk& disk, int parent, const char* name) {
+    const int made = disk.makeDirectory(parent, name, closedMode);
+    return made == -EEXIST ? 0 : -made;
+}
+
+} // namespace
+
+std::expected<MountTop, int> topOfMount(const PathResolver& resolver, const FileURL& url) {
+    auto directory = resolver.openDirectoryPath(url);
+    if (!directory)
+        return std::unexpected(directory.error());
+    const auto mount = platform::mountIdOf(directory->get());
+    if (!mount)
+        return std::unexpected(mount.error());
+    FileURL top = url;
+    while (top.path() != resolver.root().canonicalPath() && top.path() != "/") {
+        const FileURL above = top.deletingLastPathComponent();
+        auto opened = resolver.openDirectoryPath(above);
+        if (!opened)
+            return std::unexpected(opened.error());
+        const auto mountAbove = platform::mountIdOf(opened->get());
+        if (!mountAbove || *mountAbove != *mount)
+            break;
+        top = above;
+        directory = std::move(opened);
+    }
+    struct stat status{};
+    if (::fstat(directory->get(), &status) != 0)
+        return std::unexpected(errno);
+    return MountTop{
+        .url = std::move(top), .directory = std::move(*directory), .identity = {status.st_dev, status.st_ino}};
+}
+
+FileURL deathRowBelow(const FileURL& top) {
+    return top.appendingDirectory(deathRowOuter).appendingDirectory(deathRowInner);
+}
+
+OpenResult openDeathRow(int top) {
+    const OpenResult outer = openClosed(top, deathRowOuter);
+    return outer ? openClosed(outer->get(), deathRowInner) : OpenResult(std::unexpected(outer.error()));
+}
+
+OpenResult openOrMakeDeathRow(platform::Disk& disk, int top) {
+    if (const int failed = makeIfMissing(disk, top, deathRowOuter))
+        return std::unexpected(failed);
+    const OpenResult outer = openClosed(top, deathRowOuter);
+    if (!outer)
+        return std::unexpected(outer.error());
+    if (const int failed = makeIfMissing(disk, outer->get(), deathRowInner))
+        return std::unexpected(failed);
+    return openClosed(outer->get(), deathRowInner);
+}
+
+void removeEmptyDeathRow(platform::Disk& disk, int top) {
+    if (const OpenResult outer = openClosed(top, deathRowOuter))
+        if (const int removed = disk.removeDirectory(outer->get(), deathRowInner); removed == 0 || removed == -ENOENT)
+            (void)disk.removeDirectory(top, deathRowOuter);
+}
+
+} // namespace zor::fs
