@@ -23,6 +23,7 @@ constexpr std::uint32_t mobileUser = whole::mobile;
 constexpr std::uint32_t bundleUser = 33;
 constexpr const char* valueKey = "soak";
 constexpr const char* contentName = "soak-content";
+constexpr std::uint64_t codeNoSubdirectory = 6;
 constexpr std::uint64_t codeNotFound = 21;
 constexpr std::uint64_t codeNoValue = 24;
 constexpr std::uint64_t codeLocked = 61;
@@ -110,7 +111,7 @@ public:
             items_.push_back({dataApplication, mobileUser, registered_ + "." + std::to_string(i), {}});
         items_.push_back({dataKolvexPlugin, mobileUser, registered_ + ".plugin", {}});
         if (user == 0)
-            items_.push_back({bundleApplication, bundleUser, registered_ + ".bundle", {}});
+            items_.push_back({bundleApplication, bundleUser, registered_, {}});
     }
 
     /// Until the session is stopped.
@@ -182,6 +183,8 @@ private:
         if (answer)
             return true;
         item.model.mayBe(after);
+        if (item.containerClass == bundleApplication && !after)
+            groups_.emplace_back();
         if (!excused(answer))
             found(std::string(operation) + " of " + item.identifier + ": " + answer.error().message);
         // A replace that fails when the old one has moved has lost it.
@@ -300,6 +303,13 @@ private:
     }
 
     void went(Item& item) {
+        // With a live bundle go the groups of its identifier.
+        if (item.containerClass == bundleApplication && session_.trouble != Trouble::none) {
+            groups_.emplace_back();
+        } else if (item.containerClass == bundleApplication) {
+            groups_ = {{}};
+            groupsDoubted_ = false;
+        }
         // A batch passes over what it can neither move nor remove, and logs it.
         if (session_.trouble == Trouble::none)
             item.model.become(std::nullopt);
@@ -340,6 +350,8 @@ private:
         Known after{.uuid = fresh->uuid, .content = newText(), .value = ""};
         if (!putContent(fresh->path, after.content))
             return;
+        if (choices_.oneIn(3)) // given up: nothing of the live one's goes
+            return (void)answered(item, "give up transient", client_->stageForDelete({addressOf(item, after)}), before);
         std::optional<zorvane::Client::Address> old;
         if (before)
             old = addressOf(item, *before);
@@ -356,8 +368,12 @@ private:
             return;
         std::error_code error;
         files::remove_all(data->path + "/tmp", error);
-        if (worked("recreate", item.identifier, client_->recreateDefaultStructure(addressOf(item, known))) &&
-            !files::is_directory(data->path + "/tmp"))
+        const bool locked = session_.locked;
+        const auto made = client_->recreateDefaultStructure(addressOf(item, known));
+        // New directories take the recorded class, whose key may be away.
+        if (!made && made.error().code == codeNoSubdirectory && locked)
+            session_.did(name_, "recreate while locked", item.identifier);
+        else if (worked("recreate", item.identifier, made) && !files::is_directory(data->path + "/tmp"))
             found("recreate made no " + data->path + "/tmp");
     }
 

@@ -25,16 +25,20 @@ bool isAllowed(const nlohmann::json& finding) {
 
 } // namespace
 
-Surroundings::Surroundings(Session& session, std::uint64_t seed, bool diskCanBeFilled)
-    : session_(session), choices_(seed, 2000), diskCanBeFilled_(diskCanBeFilled) {}
+Surroundings::Surroundings(Session& session, Conditions& conditions, std::uint64_t seed, bool diskCanBeFilled)
+    : session_(session), conditions_(conditions), choices_(seed, 2000), diskCanBeFilled_(diskCanBeFilled) {}
 
 void Surroundings::happen(unsigned pauseMillisecondsMax) {
     sleepMilliseconds(1 + choices_.upTo(pauseMillisecondsMax));
     const auto lot = choices_.upTo(100);
-    if (lot < 70)
+    if (lot < 62)
         kill();
-    else if (lot < 78)
+    else if (lot < 70)
         boot();
+    else if (lot < 75)
+        conditions_.oneOfTwoSpeaks(choices_.oneIn(2));
+    else if (lot < 78)
+        bootWithoutAHome();
     else if (lot < 90)
         lock(!session_.locked);
     else if (lot < 95 && diskCanBeFilled_)
@@ -69,6 +73,10 @@ void Surroundings::boot() {
     ++boots_;
     session_.daemon().start({"--forget-boot"});
     check();
+}
+
+void Surroundings::bootWithoutAHome() {
+    conditions_.bootWithoutAHome([&] { boot(); });
 }
 
 void Surroundings::lock(bool locked) {

@@ -1,15 +1,15 @@
 // SPDX-License-Identifier: Apache-2.0
-// What happens to the daemon: kills, orderly ends, boots, locks of the device, a full disk, too few descriptors. And
-// what must hold whenever it starts again.
+// What happens to the daemon: kills, orderly ends, boots, locks of the device, a full disk, too few descriptors,
+// homes that are missing. And what must hold whenever it starts again.
 #pragma once
 
-#include "soak/Session.h"
+#include "soak/Conditions.h"
 
 namespace zor::soak {
 
 class Surroundings {
 public:
-    Surroundings(Session& session, std::uint64_t seed, bool diskCanBeFilled);
+    Surroundings(Session& session, Conditions& conditions, std::uint64_t seed, bool diskCanBeFilled);
     /// One event, after a random time below this.
     void happen(unsigned pauseMillisecondsMax);
     /// Ends all trouble.
@@ -32,12 +32,14 @@ private:
     void end();
     void kill();
     void boot();
+    void bootWithoutAHome();
     void lock(bool locked);
     void fillDisk();
     void starve();
     void enter(Trouble trouble);
 
     Session& session_;
+    Conditions& conditions_;
     Choices choices_;
     const bool diskCanBeFilled_;
     Count kills_ = 0;

@@ -47,6 +47,7 @@ public:
         : directory_("/dev/shm"), mounted_(::mount("soak", directory_.path().c_str(), "tmpfs", 0,
                                                    ("mode=0755,size=" + std::to_string(diskBytes)).c_str()) == 0) {}
     ~SmallDisk() {
+        // What is mounted below it goes with it.
         if (mounted_)
             ::umount2(directory_.path().c_str(), MNT_DETACH);
     }
@@ -127,9 +128,14 @@ int soak(const Options& options) {
     if (!disk.isMounted())
         std::puts("skipped: a full disk, and clients of several users; only root may mount and become others");
     whole::DaemonProcess daemon(whole::DaemonProcess::Syncs::off, disk.path());
-    daemon.start();
     Session session(daemon, options.verbose);
-    Surroundings surroundings(session, options.seed, disk.isMounted());
+    Conditions conditions(session);
+    // Every other seed has the first user's home on a file system of its own.
+    const std::string home = disk.isMounted() && options.seed % 2 == 1 ? daemon.path("private/var/mobile") : "";
+    if (!home.empty() && ::mount("soak-home", home.c_str(), "tmpfs", 0, "mode=0755,uid=501,gid=501,size=64m") == 0)
+        std::puts("the first user's home is a file system of its own");
+    daemon.start();
+    Surroundings surroundings(session, conditions, options.seed, disk.isMounted());
     HostileOwner hostile(session, options.seed);
     const auto begin = Clock::now();
 
