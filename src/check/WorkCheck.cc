@@ -147,8 +147,7 @@ void WorkCheck::checkMappings() {
             Finding& finding = look_.add(FindingCode::mappingDangling, url.appendingFile(name),
                                          "is a sandbox mapping that leads to no container", Mender::launch);
             finding.identifier = platform::percentDecode(name).value_or("");
-            if (user)
-                finding.user = *user;
+            finding.user = user;
         }
     });
 }

@@ -105,7 +105,7 @@ std::expected<PathResolver::Way, int> PathResolver::wayTo(const FileURL& url) co
     MountFence* const fence = fences_.around(path);
     const std::string_view whole(path);
     const std::size_t own = fence ? fence->ownBytes(whole) : whole.size();
-    if (own == whole.size() && (!fence || !fence->isHome()))
+    if (!fence || (own == whole.size() && !fence->isHome()))
         return Way{.fence = {}, .base = root_.descriptor(), .path = path, .mounts = Mounts::crossed};
     OpenResult base = fence->open(std::string(whole.substr(0, own)).c_str(), O_PATH | O_DIRECTORY);
     if (!base) {

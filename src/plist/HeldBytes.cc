@@ -6,7 +6,7 @@ namespace zor::plist {
 std::size_t heldBytes(const Dictionary& dictionary) {
     std::size_t bytes = 0;
     for (const auto& [key, value] : dictionary)
-        bytes += sizeof key + key.size() + heldBytes(value);
+        bytes += sizeof(std::string) + key.size() + heldBytes(value);
     return bytes;
 }
 

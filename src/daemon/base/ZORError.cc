@@ -23,7 +23,7 @@ constexpr int errnoOffset = 1000;
 
 bool isSystemCode(int number) {
     using enum ErrorCode;
-    switch (static_cast<ErrorCode>(number)) {
+    switch (std::bit_cast<ErrorCode>(static_cast<std::int64_t>(number))) {
     case success:
     case moveToTemporaryFailed:
     case transientRemovalFailed:
