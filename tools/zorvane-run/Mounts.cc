@@ -40,7 +40,7 @@ Failure notFound(const std::string& cannot, const std::string& path, const std::
     const FileDescriptor all(::open("/proc/1/root", O_PATH | O_DIRECTORY | O_CLOEXEC));
     if (!all.valid())
         return {.what = cannot + ". The daemon finds it: does the mount namespace of this process hide it",
-                .advice = std::string(unit) + "; if no unit hides it, " + advice};
+                .advice = std::string(unit).append("; if no unit hides it, ").append(advice)};
     if (openBeneath(all.get(), path.c_str() + 1, O_PATH | O_DIRECTORY))
         return {.what = cannot + ". It is there, but the mount namespace of this process hides it", .advice = unit};
     return {.what = cannot, .advice = advice};
