@@ -3,6 +3,7 @@
 #include "support/OpenWatch.h"
 #include "world/World.h"
 
+#include <atomic>
 #include <filesystem>
 #include <gtest/gtest.h>
 #include <sys/wait.h>
@@ -176,9 +177,9 @@ TEST_F(Known, ASizeIsNotKeptForWhatMovedMeanwhile) {
     const FoundContainer bundle = world.make("com.example", ContainerClass::bundleApplication);
     const Address address = addressOf(bundle);
     world.write(world.relative(bundle.path) + "/a/file", "x");
-    bool moved = false;
+    std::atomic<bool> moved{false};
     const support::OpenWatch watch(bundle.path + "/a", [&] {
-        const bool first = !std::exchange(moved, true);
+        const bool first = !moved.exchange(true);
         EXPECT_TRUE(!first || client().regenerateDirectoryUUIDForUser(address));
         return true;
     });

@@ -9,6 +9,7 @@
 #include "world/World.h"
 
 #include <algorithm>
+#include <atomic>
 #include <condition_variable>
 #include <csignal>
 #include <fcntl.h>
@@ -299,9 +300,9 @@ TEST_F(Protection, TheContainerChangesMeanwhile) {
         SCOPED_TRACE(row.name);
         useContainer();
         put("Documents/file", 4);
-        bool done = false;
+        std::atomic<bool> done{false};
         const support::OpenWatch watch(container.path + "/Documents", [&] {
-            if (!std::exchange(done, true))
+            if (!done.exchange(true))
                 row.meanwhile();
             return true;
         });
