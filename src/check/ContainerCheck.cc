@@ -209,7 +209,7 @@ std::shared_ptr<ZORMetadata> ContainerCheck::readRecord(const ClassDirectory& di
     auto read = reader.judge(name);
     if (read)
         return std::move(*read);
-    // Whose it is nobody can tell while the key of its encryption is away: it may well be whole.
+    // Nobody can tell its owner while the key of its encryption is away: it may well be whole.
     if (const ZORError* cause = read.error().error.underlying(); cause && cause->isPosix(ENOKEY)) {
         look_.addUnexamined(directory.url.appendingDirectory(name), ENOKEY).user = directory.user;
         return nullptr;
@@ -289,7 +289,7 @@ void ContainerCheck::remember(ClassDirectory& directory, const Container& contai
     const auto [row, isFirst] = directory.known.try_emplace(container.record->identifier(), container.url);
     if (isFirst)
         return;
-    // Of two, the one that the directory lists later counts; a daemon that runs may have read another order.
+    // The later of two in the directory counts; a daemon that runs may have read another order.
     FileURL hidden = std::exchange(row->second, container.url);
     const CheckOptions& options = look_.options();
     const bool asks = options.daemonServes && !directory.transient;

@@ -23,8 +23,8 @@ namespace zor::check {
 struct CheckOptions {
     /// The daemon answers its clients: what its start makes must be there.
     bool daemonServes = false;
-    /// Where the live container lies that such a daemon gives its clients; nothing when it does not say. Asked only of
-    /// an identifier that has several, for what a daemon remembers is not to be seen on the disk.
+    /// The place of the live container that such a daemon gives its clients; nothing when it does not say. Asked only
+    /// of an identifier that has several, for what a daemon remembers is not to be seen on the disk.
     std::function<std::optional<std::string>(ContainerClass, std::uint32_t user, const std::string& identifier)>
         servedPath;
     /// UUIDs of containers whose data-protection class is being changed.

@@ -14,7 +14,7 @@ struct DaemonOptions {
     bool foreground = false;
     int logLevel = 5;
     bool forgetBoot = false;
-    /// Of one user; see StoreLimits.
+    /// One user's; see StoreLimits.
     std::optional<std::size_t> containersPerUser;
 };
 

@@ -241,7 +241,7 @@ private:
     /// The standard subdirectories of the container that `changed` begins with; each is added to it. New ones get the
     /// protection class.
     Result<void> makeSubdirectories(const ContainerLayout& layout, int protectionClass, std::vector<FileURL>& changed);
-    /// Of a container that lies in its place, but whose move there could not be synced. The record says so until one
+    /// The error of a container whose move into its place could not be synced. The record says so until one
     /// is.
     ZORError notLasting(const char* function, ErrorCode code, const FileURL& container, const ZORError& cause);
     /// Makes what was moved into or out of these directories durable; the error is not logged.
@@ -257,7 +257,7 @@ private:
     /// Tries the replaces that wait and that could bring back a container of this identifier, or one to this place.
     /// Whether there were any; error 35 while one is left. The caller holds the all-identifiers lock for writing.
     Result<bool> settleReplaces(const ContainerAtStake& atStake);
-    /// Where the journals could not be listed. Error 35 while they cannot and staging may hold what is at stake.
+    /// For journals that could not be listed. Error 35 while they cannot and staging may hold a container at stake.
     Result<void> listReplacesAgain(const ContainerAtStake& atStake);
     /// Whether what waits at `staged` may be one of this identifier, or come back to this place.
     bool mayComeBack(const FileURL& staged, const WaitingReplaces::Waiting& waiting, const ContainerAtStake& atStake);

@@ -30,7 +30,7 @@ using namespace zor;
 /// Two arenas serve the few threads that run at once; one for each thread that ever was would keep memory for ever.
 constexpr int mallocArenas = 2;
 
-/// What the service manager is told while the setup goes on: it waits this long, in microseconds, for the next word.
+/// Told to the service manager while the setup goes on: it waits this long, in microseconds, for the next word.
 /// One item, perhaps a large tree that an old system left on another file system, may take minutes.
 constexpr std::string_view setupGoesOn = "EXTEND_TIMEOUT_USEC=600000000";
 

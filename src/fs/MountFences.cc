@@ -23,7 +23,7 @@ using platform::openBeneathOnMount;
 namespace {
 
 constexpr int pathFlags = O_PATH | O_DIRECTORY | O_NOFOLLOW;
-/// Of a class below the place of its containers, such as "Data/System".
+/// The path of a class below the place of its containers, such as "Data/System".
 constexpr std::size_t classLevels = 2;
 
 /// File systems that nobody but the kernel serves, from what lies in this machine.
@@ -38,7 +38,7 @@ struct Freed {
     void operator()(char* memory) const { std::free(memory); }
 };
 
-/// Of the type and the options behind the " - " of a line.
+/// The type and the options behind the " - " of a line.
 MountKind kindOf(std::string_view type, std::string_view options) {
     if (std::ranges::find(localTypes, type) != localTypes.end())
         return MountKind::local;
@@ -178,7 +178,7 @@ int MountFence::rememberedStatus(const char* path, struct stat& status) {
 }
 
 int MountFence::status(const char* path, struct stat& status) {
-    // What is remembered, and lies on the mount that was judged, is found without a question to any file system.
+    // A name that the kernel remembers on the judged mount is found without a question to any file system.
     if (rememberedStatus(path, status) == 0)
         return 0;
     const std::size_t own = ownBytes(path);

@@ -37,14 +37,14 @@ inline constexpr std::chrono::milliseconds homeAnswerHolds{1000};
 /// How long a home is waited for. A file system over a network that takes longer stops its user's requests only.
 inline constexpr std::chrono::milliseconds homePatience{2000};
 
-/// Of a home's mount.
+/// A home's mount.
 enum class MountKind {
     unknown,
     local,    ///< a disk, or memory, of this machine
     mayHang,  ///< somebody else serves it
     usersOwn, ///< a user of this machine serves it
 };
-/// What /proc/self/mountinfo says of the mount with that number.
+/// The line of /proc/self/mountinfo for the mount with that number.
 [[nodiscard]] MountKind kindOfMount(std::uint64_t number);
 
 class MountFence {

@@ -46,7 +46,7 @@ struct DirectoryAttributes {
     mode_t mode = 0755;
     std::uint32_t owner = ownerUnchanged; // user id and group id alike
     int protectionClass = protectionClassUnchanged;
-    /// Of missing levels that are made on the way.
+    /// Attributes of missing levels that are made on the way.
     mode_t intermediateMode = 0755;
     /// A second user to whom an existing directory may belong; it is left to that user as it is.
     std::uint32_t otherOwner = ownerUnchanged;
@@ -191,7 +191,7 @@ private:
     /// To one that was there: judges it first.
     Result<void> mendDirectory(int directory, const FileURL& url, const DirectoryAttributes& attributes);
     Result<void> setDirectoryClass(int directory, const std::string& path, int protectionClass);
-    /// Who a directory for `owner` belongs to in the end.
+    /// The user to whom a directory for `owner` belongs in the end.
     [[nodiscard]] uid_t ownerToBe(std::uint32_t owner) const;
     struct Standard {
         uid_t uid;

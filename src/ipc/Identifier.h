@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What can be an identifier: of a container, of a program, of a group. Pure; any thread.
+// The rule for identifiers: of a container, of a program, of a group. Pure; any thread.
 #pragma once
 
 #include <cstddef>

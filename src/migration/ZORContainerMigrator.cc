@@ -40,7 +40,7 @@ bool isMisshapen(const ZORError& error) {
     return error.isPosix(ELOOP) || error.isPosix(ENOTDIR);
 }
 
-/// Of a container: whether it was not looked at, or not written, rather than judged not to be a bundle's.
+/// Whether a container was not looked at, or not written, rather than judged not to be a bundle's.
 bool isUnfinished(const ZORError& error) {
     const ZORError* const cause = error.underlying();
     return error.is(ErrorCode::propertyListNotWritten) ||

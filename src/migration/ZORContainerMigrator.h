@@ -64,7 +64,7 @@ private:
     struct Count {
         std::uint64_t errors = 0;
         std::uint64_t migrated = 0;
-        /// Of the errors those that the next boot may not meet: no marker then.
+        /// Those errors that the next boot may not meet: no marker then.
         std::uint64_t unfinished = 0;
         std::optional<ZORError> last;
     };

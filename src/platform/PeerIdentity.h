@@ -20,7 +20,7 @@ struct IdentityGrant {
     bool kernelAgent = false;
     /// The peer may ask for its own identifier only.
     bool onlyOwnIdentifier = false;
-    /// What all entries of the identifier entitle it to together; absent where this is its only entry. Stored for the
+    /// The entitlements of all entries of the identifier together; absent where this is its only entry. Stored for the
     /// identifier, and no power.
     std::optional<plist::Dictionary> identifierEntitlements;
 };

@@ -41,7 +41,7 @@ public:
     void reportAll();
 
 private:
-    /// What was written in the second or minute that began then.
+    /// Lines written in the second or minute that began then.
     struct Window {
         Clock::time_point begun;
         std::size_t written = 0;
@@ -60,7 +60,7 @@ private:
         uid_t uid = 0;
         std::uint64_t leftOut = 0;
     };
-    /// What is to be done without the lock.
+    /// Left to be done without the lock.
     struct Outcome {
         std::array<Ended, usersMax + 1> ended;
         std::size_t count = 0;

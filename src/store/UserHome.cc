@@ -86,7 +86,7 @@ UserHome::Seen UserHome::look() {
     Found now = id && *id == before.id ? before : find();
     const MutexLock held(mutex_);
     dueMilliseconds_ = now.state == State::present ? coarseMilliseconds() + lookEveryMilliseconds : 0;
-    // What could not be looked at leaves what was known.
+    // A look that fails leaves the state that was known.
     if (now.state == State::unknown)
         return {.state = State::unknown, .directory = {}, .generation = generation()};
     if (now != found_) {

@@ -42,14 +42,14 @@ public:
         State state = State::unknown;
         /// While it is present: its path, without links.
         std::optional<FileURL> directory;
-        /// Of what is seen now; never 0.
+        /// The generation of this state; never 0.
         std::uint64_t generation = 0;
     };
     /// Asks the disk.
     Seen look() ZOR_EXCLUDES(mutex_);
     /// The same, but a home that was seen within the last second is taken to be there still: no system call then.
     Seen lookIfDue() ZOR_EXCLUDES(mutex_);
-    /// Of the last look; 0 before the first. One atomic read.
+    /// The last look's; 0 before the first. One atomic read.
     [[nodiscard]] std::uint64_t generation() const { return generation_.load(std::memory_order_acquire); }
 
     /// The home that the password database names, without links; the errno when it names none, or one that is not

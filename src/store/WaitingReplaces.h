@@ -19,7 +19,7 @@ class WaitingReplaces {
 public:
     struct Waiting {
         FileURL journalUrl;
-        // Where the old container was, and where the new one was to be; empty while the journal cannot be read.
+        // The old container's place, and the one meant for the new; empty while the journal cannot be read.
         FileURL oldUrl{};
         FileURL destUrl{};
     };

@@ -28,7 +28,7 @@ const char* suffix(bool transient) {
 constexpr std::chrono::seconds lookOverPauseMin{1};
 constexpr int lookOverShare = 100;
 
-/// What the look for a metadata file gives for something else in its place; no errno.
+/// The look for a metadata file gives this for something else in its place; no errno.
 constexpr int isNoFile = -1;
 
 long number(ContainerClass containerClass) {
@@ -293,16 +293,15 @@ Result<ZORContainerCache::Record> ZORContainerCache::containerForUser(std::uint3
     return Record();
 }
 
-Result<std::vector<ZORContainerCache::Record>>
-ZORContainerCache::allContainersForUser(std::uint32_t userId, ContainerClass containerClass, bool transient) {
+template <typename Take>
+Result<std::vector<ZORContainerCache::Record>> ZORContainerCache::listed(const Key& key, const Take& take) {
     return boundary_.run(ZOR_HERE, [&]() -> Result<std::vector<Record>> {
         const Here here{"allContainersForUser", __LINE__};
-        if (!isValidClass(containerClass))
+        if (!isValidClass(key.containerClass))
             return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
-                             "Invalid Content Class: %ld", number(containerClass));
-        const Key key{userId, containerClass, transient};
+                             "Invalid Content Class: %ld", number(key.containerClass));
         return withCurrentHome(key, [&]() -> Result<std::vector<Record>> {
-            std::vector<Found> all;
+            std::vector<Found> found;
             std::uint64_t homeGeneration = 0;
             {
                 const MutexLock held(cacheLock_);
@@ -310,12 +309,19 @@ ZORContainerCache::allContainersForUser(std::uint32_t userId, ContainerClass con
                 if (!cache)
                     return failedToRebuild(here, key, cache.error());
                 homeGeneration = (*cache)->homeGeneration;
-                all.reserve((*cache)->entries.size());
-                for (const Entry& entry : (*cache)->entries)
-                    all.push_back({.record = entry.record, .place = entry.record->place()});
+                take((*cache)->entries, found);
             }
-            return thoseOnDisk(here, key, std::move(all), homeGeneration);
+            return thoseOnDisk(here, key, std::move(found), homeGeneration);
         });
+    });
+}
+
+Result<std::vector<ZORContainerCache::Record>>
+ZORContainerCache::allContainersForUser(std::uint32_t userId, ContainerClass containerClass, bool transient) {
+    return listed(Key{userId, containerClass, transient}, [](const auto& entries, std::vector<Found>& all) {
+        all.reserve(entries.size());
+        for (const Entry& entry : entries)
+            all.push_back({.record = entry.record, .place = entry.record->place()});
     });
 }
 
@@ -330,7 +336,7 @@ ZORContainerCache::thoseOnDisk(Here here, const Key& key, std::vector<Found> fou
         if (there)
             records.push_back(std::move(one.record));
     }
-    // What went with its home is not gone.
+    // Containers that went with their home are not gone.
     UserHome* const home = records.size() == found.size() ? nullptr : homeOf(key);
     if (home && home->look().generation != homeGeneration)
         return failedToRebuild(here, key,
@@ -341,42 +347,25 @@ ZORContainerCache::thoseOnDisk(Here here, const Key& key, std::vector<Found> fou
 Result<ZORContainerCache::PageOfRecords> ZORContainerCache::pageOfContainersForUser(std::uint32_t userId,
                                                                                     ContainerClass containerClass,
                                                                                     bool transient, const Page& page) {
-    return boundary_.run(ZOR_HERE, [&]() -> Result<PageOfRecords> {
-        const Here here{"allContainersForUser", __LINE__};
-        if (!isValidClass(containerClass))
-            return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
-                             "Invalid Content Class: %ld", number(containerClass));
-        const Key key{userId, containerClass, transient};
-        const auto before = [](const Record& left, const Record& right) {
-            return left->identifier() < right->identifier();
-        };
-        return withCurrentHome(key, [&]() -> Result<PageOfRecords> {
-            std::vector<Found> found;
-            PageOfRecords result;
-            std::uint64_t homeGeneration = 0;
-            {
-                const MutexLock held(cacheLock_);
-                const auto cache = wholeCache(key);
-                if (!cache)
-                    return failedToRebuild(here, key, cache.error());
-                homeGeneration = (*cache)->homeGeneration;
-                std::vector<Record> records;
-                records.reserve((*cache)->entries.size());
-                for (const Entry& entry : (*cache)->entries)
-                    if (page.after.empty() || entry.record->identifier() > page.after)
-                        records.push_back(entry.record);
-                const auto end =
-                    records.begin() + static_cast<std::ptrdiff_t>(std::min(records.size(), page.containersMax));
-                std::partial_sort(records.begin(), end, records.end(), before);
-                if (end != records.end())
-                    result.next = end[-1]->identifier();
-                for (auto record = records.begin(); record != end; ++record)
-                    found.push_back({.record = *record, .place = (*record)->place()});
-            }
-            result.records = TRY(thoseOnDisk(here, key, std::move(found), homeGeneration));
-            return result;
-        });
-    });
+    PageOfRecords result;
+    const auto before = [](const Record& left, const Record& right) {
+        return left->identifier() < right->identifier();
+    };
+    result.records =
+        TRY(listed(Key{userId, containerClass, transient}, [&](const auto& entries, std::vector<Found>& found) {
+            std::vector<Record> records;
+            records.reserve(entries.size());
+            for (const Entry& entry : entries)
+                if (page.after.empty() || entry.record->identifier() > page.after)
+                    records.push_back(entry.record);
+            const auto end =
+                records.begin() + static_cast<std::ptrdiff_t>(std::min(records.size(), page.containersMax));
+            std::partial_sort(records.begin(), end, records.end(), before);
+            result.next = end != records.end() ? std::optional(end[-1]->identifier()) : std::nullopt;
+            for (auto record = records.begin(); record != end; ++record)
+                found.push_back({.record = *record, .place = (*record)->place()});
+        }));
+    return result;
 }
 
 bool ZORContainerCache::buildAllOfUser(std::uint32_t userId) {

@@ -66,7 +66,7 @@ public:
         /// The identifier behind which the next page begins; absent when there is none.
         std::optional<std::string> next;
     };
-    /// Of those, in the order of their identifiers' bytes, the first `containersMax` behind `after`; an empty one is
+    /// The first `containersMax` of those behind `after`, in the order of their identifiers' bytes; an empty one is
     /// before all. Looks at no metadata file of others.
     Result<PageOfRecords> pageOfContainersForUser(std::uint32_t userId, ContainerClass containerClass, bool transient,
                                                   const Page& page);
@@ -82,7 +82,7 @@ public:
     /// user's home is missing that comes again.
     struct Held {
         std::size_t containers = 0;
-        /// Of memory, of the info values.
+        /// Memory of the info values.
         std::size_t infoBytes = 0;
     };
     [[nodiscard]] Held heldByUser(std::uint32_t userId) ZOR_EXCLUDES(cacheLock_);
@@ -108,7 +108,7 @@ private:
     struct ClassCache {
         std::unordered_set<Entry, IdentifierOf, IdentifierOf> entries;
         std::size_t infoBytes = 0; // the sum of the entries'
-        /// Of the home that they were read from.
+        /// The generation of the home that they were read from.
         std::uint64_t homeGeneration = 0;
         /// There may be others, which an encryption hid when the directory was read.
         bool hidesSome = false;
@@ -150,6 +150,9 @@ private:
     bool lookOver(const Key& key, const Found& gone) ZOR_EXCLUDES(cacheLock_);
     /// Code 44 or 47 unless the look for the file found it; 43 where it is hidden.
     Result<void> checkOnDisk(Here here, const Key& key, const Found& found, int missing, const char* foundFormatPrefix);
+    /// The containers that `take` chooses of a class's entries, under the cache's lock, and whose files are there.
+    template <typename Take>
+    Result<std::vector<Record>> listed(const Key& key, const Take& take);
     /// Error 43 also when they were of a home that has changed since.
     Result<std::vector<Record>> thoseOnDisk(Here here, const Key& key, std::vector<Found> found,
                                             std::uint64_t homeGeneration);

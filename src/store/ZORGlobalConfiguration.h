@@ -75,12 +75,12 @@ public:
     /// alone.
     std::optional<UsableDirectory> openClassDirectory(std::uint32_t userId, ContainerClass containerClass,
                                                       bool transient);
-    /// Who such a directory belongs to; ownerUnchanged: the daemon.
+    /// The user to whom such a directory belongs; ownerUnchanged: the daemon.
     [[nodiscard]] static std::uint32_t ownerOfClassDirectory(ContainerClass containerClass, std::uint32_t userId);
     /// The same by its place; absent where no class has its directory.
     [[nodiscard]] std::optional<std::uint32_t> ownerOfClassDirectory(const FileURL& directory);
 
-    /// Where it is, or would be; not made here.
+    /// Its place, made or not; nothing is made here.
     std::optional<FileURL> placeOfClass(std::uint32_t userId, ContainerClass containerClass, bool transient);
 
     /// What a user keeps in an application's data container.

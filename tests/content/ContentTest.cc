@@ -287,7 +287,7 @@ TEST(Content, HostileDirectories) {
         {"metadata", [](const std::string& folder) { writeFile(folder + "/../../" + metadata, "forged"); }},
         {"another file system", [](const std::string& folder) { ::mount("none", folder.c_str(), "tmpfs", 0, ""); },
          true},
-        // What is root's, in directories of somebody who may have moved it there.
+        // Root's items in directories of somebody who may have moved them there.
         {"closed to user 501",
          [](const std::string& folder) {
              writeFile(folder + "/x", "SECRET");

@@ -84,7 +84,7 @@ TEST(PeerThreat, AProgramThatGivesAGroup) {
     };
     EXPECT_EQ(judged({}), "-");
     EXPECT_EQ(judged([] { return ::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) == 0; }), "sleeper");
-    // Who has no capability keeps no group of before but this one.
+    // Without a capability a process keeps no earlier group but this one.
     const PeerProcess process(world.server, world.program("sleeper"),
                               {.prepare = [] { return ::setresgid(given, given, given) == 0; }, .argument = "1000"});
     EXPECT_EQ(who(*world.peerOf(process)), "sleeper");

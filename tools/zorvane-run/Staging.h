@@ -12,13 +12,13 @@
 
 namespace zorvanerun {
 
-/// What the sandbox has in memory, for what several processes of the program share.
+/// The sandbox's files in memory, which several processes of the program share.
 inline constexpr std::array<const char*, 2> memoryPlaces = {"/dev/shm", "/tmp"};
 
 /// Where the mount with this index is, after stage().
 [[nodiscard]] std::string stagedPath(std::size_t index);
 
-/// Where the memory for the place with this index is then, empty and bounded.
+/// The place of the memory with this index, empty and bounded.
 [[nodiscard]] std::string stagedMemoryPath(std::size_t index);
 
 /// Moves this process into a mount namespace of its own, with everything that has a descriptor in its place there.

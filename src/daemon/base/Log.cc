@@ -12,7 +12,7 @@ thread_local std::optional<std::uint32_t> provokingUserId;
 /// Time, process and level, before the function's name.
 constexpr std::size_t lineHeadBytes = 64;
 
-/// What a line takes: escapes are up to four times as long as what they stand for.
+/// The bytes of a line: an escape is up to four times as long as the character that it stands for.
 std::size_t bytesInLog(const char* function, std::string_view message) {
     std::string shown = function;
     plist::appendEscaped(shown, message);

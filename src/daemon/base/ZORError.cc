@@ -18,7 +18,7 @@ bool ZORError::isOwnShortage() const {
 
 namespace {
 
-/// Where the numbers of errno that read as codes of the system go; clients know the offset (client/ErrorText.cc).
+/// Added to an errno that reads as a code of the system; clients know the offset (client/ErrorText.cc).
 constexpr int errnoOffset = 1000;
 
 bool isSystemCode(int number) {

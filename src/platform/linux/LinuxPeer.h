@@ -35,7 +35,7 @@ public:
         uid_t uid = 0;
         gid_t gid = 0;
     };
-    /// What a process runs, by its /proc directory; or the errno of the look.
+    /// The program that a process runs, by its /proc directory; or the errno of the look.
     [[nodiscard]] static std::expected<Executable, int> executableOf(int process);
 
     /// What the kernel said when the connection was accepted.

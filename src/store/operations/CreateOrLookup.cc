@@ -126,7 +126,7 @@ Result<void> ZORClientConnection::discardTransient(const ZORMetadata& record, co
     const FileURL url = record.url();
     const auto moved =
         _moveItemAtURLToDeathRow(url, StartDeletionThread::yes, topLevelOwnerOf(record.containerClass(), record.uid()));
-    // Where another's directory is in its place, the container is gone.
+    // With another's directory in its place, the container is gone.
     if (!moved && !(moved.error().underlying() && moved.error().underlying()->isPosix(notTheContainer)))
         return makeError(services_.log, {"createOrLookupContainerForUser", __LINE__}, ErrorCode::transientRemovalFailed,
                          &moved.error(), LogFlag::yes, "Failed to remove transient container at %s", url.c_str());
@@ -161,7 +161,7 @@ Result<FoundContainer> ZORClientConnection::create(std::uint32_t userId, const s
             transient ? nullptr : services_.whitelist.wellknownContainerForId(identifier, containerClass);
         const auto moved = [&]() -> Result<void> {
             const auto classDirectory = services_.configuration.openClassDirectory(userId, containerClass, transient);
-            // What was looked for in one home is not made in another.
+            // A container that was looked for in one home is not made in another.
             const UserHome* const home =
                 isPerUserClass(containerClass) ? services_.configuration.homeOf(userId) : nullptr;
             if (!classDirectory || (home && home->generation() != homeGeneration))

@@ -48,17 +48,22 @@ Result<void> ZORClientConnection::_moveItemAtURLToDeathRow(const FileURL& url, S
     ZORFileManager& fileManager = services_.fileManager;
     const FileURL deathRow = services_.configuration.deathrowDirectory();
     for (int tried = 0;; ++tried) {
-        const auto unique = fileManager.createTemporaryDirectoryInDirectoryURL(deathRow);
-        if (!unique)
-            return makeError(services_.log, {moveFunction, __LINE__}, ErrorCode::moveToDeathRowFailed, &unique.error(),
-                             LogFlag::yes, "Failed to create unique directory at: %s", url.c_str());
-        const FileURL destination = unique->appendingDirectory(url.lastPathComponent());
-        const auto moved = [&] {
+        std::optional<FileURL> unique;
+        // A pass that met the fresh directory before what comes into it has been judged would remove that with it.
+        const auto moved = [&]() -> Result<DeathRow> {
             const platform::MutexLock moving(services_.deathRow.moving);
+            auto made = fileManager.createTemporaryDirectoryInDirectoryURL(deathRow);
+            if (!made)
+                return std::move(made).error();
+            const FileURL destination = made->appendingDirectory(url.lastPathComponent());
+            unique.emplace(std::move(*made));
             return condemn(url, destination, owner, moving);
         }();
+        if (!unique)
+            return makeError(services_.log, {moveFunction, __LINE__}, ErrorCode::moveToDeathRowFailed, &moved.error(),
+                             LogFlag::yes, "Failed to create unique directory at: %s", url.c_str());
         if (moved && *moved == DeathRow::ofFileSystem)
-            (void)fileManager.removeItemAtURL(*unique);
+            (void)fileManager.removeItemAtURL(unique);
         if (moved) {
             if (startDeletionThread == StartDeletionThread::yes)
                 deleteContainersOnDeathRowWithCompletion(nullptr);
@@ -72,7 +77,8 @@ Result<void> ZORClientConnection::_moveItemAtURLToDeathRow(const FileURL& url, S
         if (somethingMissing && fileManager.itemDoesNotExistAtURL(*unique) && tried < directoriesTriedMax)
             continue;
         return makeError(services_.log, {moveFunction, __LINE__}, ErrorCode::moveToDeathRowFailed, &moved.error(),
-                         LogFlag::yes, "Failed to move item at: %s to: %s", url.c_str(), destination.c_str());
+                         LogFlag::yes, "Failed to move item at: %s to: %s", url.c_str(),
+                         unique->appendingDirectory(url.lastPathComponent()).c_str());
     }
 }
 

@@ -94,7 +94,7 @@ Result<void> ZORClientConnection::stageForDelete(const DeletionBatch& batch, std
                   uuid ? uuid->string().c_str() : "(null)", ZOR_SHOWN(identifier), static_cast<long>(containerClass));
         return {};
     }
-    // Where another waits to come back, the place of this one is not made free for it.
+    // A container that waits to come back is not given the place of this one.
     const auto record = TRY(settledContainer(userId, containerClass, &*identifier, *uuid));
     if (!record)
         return {};

@@ -52,7 +52,7 @@ bool isClosedAndMarked(int directory) {
 
 } // namespace
 
-/// What one pass has met.
+/// The state of one pass.
 struct ZORClientConnection::DeletionPass {
     std::optional<ZORError> last;
     DeathRowReport::Left left;

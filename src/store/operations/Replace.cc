@@ -267,7 +267,7 @@ Result<void> ZORClientConnection::moveOldAway(const ReplaceRequest& request, Rep
     if (*moved == ZORFileManager::Moved::byCopy && !services_.fileManager.itemDoesNotExistAtURL(progress.oldUrl))
         return oldNotMoved(posixError(here, EBUSY, "%s is still there", progress.oldUrl.c_str()));
     progress.moved = &directories.dest;
-    // Where nothing else keeps the order of two moves, a cut could leave the second one without the first.
+    // A cut could leave the second of two moves without the first, with nothing else to keep their order.
     if (const int ordered = services_.durability.between(directories.staging.get(), directories.dest.get());
         ordered < 0)
         return undoFirstMove(

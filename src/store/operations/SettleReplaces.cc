@@ -75,7 +75,7 @@ Result<bool> ZORClientConnection::settleReplaces(const ContainerAtStake& atStake
         // What came back is not in it; also a try that failed may have brought it back, and only not rid the journal.
         services_.cache.dropAll();
         TRY(recovered);
-        // Of one that was done; of one that was undone nothing is left there.
+        // A replace that was done; one that was undone has left nothing there.
         (void)_moveItemAtURLToDeathRow(staged, StartDeletionThread::yes);
         settled = true;
     }

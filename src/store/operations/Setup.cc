@@ -166,7 +166,7 @@ void ZORClientConnection::reportOrphan(const FileURL& entry) {
 
 std::uint64_t ZORClientConnection::_cleanupOrphanedDataForUser(std::uint32_t userId, ContainerClass containerClass) {
     const auto directory = services_.configuration.openClassDirectory(userId, containerClass, false);
-    // What another's directory holds there is no orphan; the getter has said so.
+    // The content of another's directory there is no orphan; the getter has said so.
     if (!directory || !directory->opened)
         return 0;
     std::uint64_t removed = 0;

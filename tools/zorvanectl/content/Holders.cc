@@ -100,7 +100,7 @@ private:
     }
 
     Outcome<FileDescriptor> openLast(const std::string& name) {
-        // What is no regular file must not hold the opening.
+        // An item that is no regular file must not hold the opening.
         constexpr int flags = O_RDONLY | O_NONBLOCK | O_NOCTTY | O_NOFOLLOW | O_CLOEXEC;
         FileDescriptor last(::openat(directory_.get(), name.c_str(), flags));
         struct stat status{};
