@@ -2,8 +2,8 @@
 // A class directory full of containers, each as small as one can be: a directory with its metadata file.
 #pragma once
 
-#include "daemon/base/ContainerClass.h"
-#include "platform/FileDescriptor.h"
+#include "base/ContainerClass.h"
+#include "os/FileDescriptor.h"
 
 #include <string>
 

@@ -3,10 +3,10 @@
 // client of the floor is the same, so that what it costs is on both sides of a ratio.
 #pragma once
 
-#include "daemon/base/ContainerClass.h"
-#include "daemon/base/UserIdentity.h"
+#include "base/ContainerClass.h"
+#include "base/UserIdentity.h"
 #include "ipc/Keys.h"
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 #include "plist/Value.h"
 
 #include <cstdint>

@@ -4,7 +4,7 @@
 #include "Processes.h"
 #include "Report.h"
 #include "Statistics.h"
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 
 #include <algorithm>
 #include <dirent.h>

@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Daemon.h"
 
+#include "base/EntitlementKeys.h"
 #include "ipc/Names.h"
-#include "platform/EntitlementKeys.h"
-#include "platform/linux/Names.h"
+#include "os/Names.h"
 #include "plist/Binary.h"
 
 #include <cerrno>

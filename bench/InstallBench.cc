@@ -3,7 +3,7 @@
 #include "Benchmarks.h"
 #include "ContentTree.h"
 
-#include "platform/EntitlementKeys.h"
+#include "base/EntitlementKeys.h"
 
 #include <filesystem>
 

@@ -4,9 +4,9 @@
 #include "Benchmarks.h"
 #include "RoundTripPairs.h"
 
-#include "entitlements/ZOREntitlementMapping.h"
+#include "base/EntitlementKeys.h"
 #include "ipc/Keys.h"
-#include "platform/EntitlementKeys.h"
+#include "operations/ZOREntitlementMapping.h"
 #include "store/Names.h"
 
 #include <sys/stat.h>

@@ -3,8 +3,8 @@
 // the same mounts and namespaces.
 #include "Benchmarks.h"
 
-#include "entitlements/ZOREntitlementMapping.h"
 #include "ipc/Keys.h"
+#include "operations/ZOREntitlementMapping.h"
 
 #include <array>
 #include <cstdio>

@@ -3,7 +3,7 @@
 
 #include "Processes.h"
 #include "Report.h"
-#include "platform/linux/SemaphoreBootMarker.h"
+#include "device/SemaphoreBootMarker.h"
 
 #include <cerrno>
 #include <fcntl.h>

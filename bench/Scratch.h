@@ -7,7 +7,7 @@
 // watches over the run, or by the next run. One run at a time.
 #pragma once
 
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 
 #include <cstdint>
 #include <memory>

@@ -5,7 +5,7 @@
 // exact, needs no tool, but slow, so nothing is timed meanwhile.
 #pragma once
 
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 
 #include <atomic>
 #include <thread>

@@ -6,7 +6,7 @@
 #include "Report.h"
 #include "Statistics.h"
 #include "fs/MetadataFileName.h"
-#include "platform/linux/Names.h"
+#include "os/Names.h"
 #include "plist/Binary.h"
 #include "store/ZORMetadata.h"
 

@@ -4,7 +4,7 @@
 // it was moved into.
 #pragma once
 
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 
 #include <string>
 #include <vector>

@@ -3,9 +3,9 @@
 // whether the containers exist; and what a thousand upcalls a second do to a client's lookups beside them.
 #include "Benchmarks.h"
 #include "RoundTripPairs.h"
+#include "base/EntitlementKeys.h"
 #include "ipc/Names.h"
-#include "platform/EntitlementKeys.h"
-#include "platform/linux/Names.h"
+#include "os/Names.h"
 #include "plist/Binary.h"
 #include "upcall/packbuff/Packbuff.h"
 #include "upcall/packbuff/UpcallMessage.h"

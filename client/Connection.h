@@ -2,7 +2,7 @@
 // One stream to the daemon: requests out, replies in, told apart by their ids. One thread at a time.
 #pragma once
 
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 #include "plist/Value.h"
 #include "zorvane/Client.h"
 

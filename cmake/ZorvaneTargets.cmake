@@ -79,15 +79,6 @@ function(zor_library name)
     endforeach()
 endfunction()
 
-# zor_cross(lower upper): sources of the lower library call the upper one too. Only static libraries may link in a circle.
-function(zor_cross lower upper)
-    get_target_property(lowerType zor_${lower} TYPE)
-    get_target_property(upperType zor_${upper} TYPE)
-    if(lowerType STREQUAL "STATIC_LIBRARY" AND upperType STREQUAL "STATIC_LIBRARY")
-        target_link_libraries(zor_${lower} PUBLIC zor_${upper})
-    endif()
-endfunction()
-
 # zor_program(name SOURCES files... | DIR folders... LINK ...)
 function(zor_program name)
     cmake_parse_arguments(ARG "" "" "DIR;SOURCES;LINK" ${ARGN})

@@ -3,10 +3,10 @@
 // of them, and takes a change whose result the next daemon reads. Runs over one root in memory that lives as long as
 // the fuzzer.
 #include "daemon/Composition.h"
+#include "daemon/LinuxPlatform.h"
 #include "fs/AtomicFile.h"
 #include "fs/DictionaryFile.h"
 #include "fs/RecursiveRemove.h"
-#include "platform/linux/LinuxPlatform.h"
 #include "store/Names.h"
 
 #include <algorithm>

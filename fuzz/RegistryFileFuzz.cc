@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // Goal: no bytes of a registry file bring the reader down, and what it takes it understands. Method: parse; an entry
 // that comes out has the form that matching relies on.
-#include "platform/EntitlementKeys.h"
-#include "platform/linux/IdentityFile.h"
+#include "base/EntitlementKeys.h"
+#include "identity/IdentityFile.h"
 
 #include <cstddef>
 #include <cstdint>

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "check/CheckedSystem.h"
 
-#include "platform/linux/DaemonLock.h"
+#include "os/DaemonLock.h"
 
 #include <cerrno>
 #include <fcntl.h>

@@ -4,15 +4,15 @@
 // Opening it makes nothing, takes no lock and asks no daemon. One thread.
 #pragma once
 
+#include "base/Log.h"
 #include "check/ReadOnlyDisk.h"
-#include "daemon/base/Log.h"
+#include "device/FileDeviceLockState.h"
+#include "device/SemaphoreBootMarker.h"
+#include "device/XattrProtectionClass.h"
 #include "fs/ZORFileManager.h"
+#include "identity/LinuxPasswordDatabase.h"
+#include "os/SystemRoot.h"
 #include "platform/PlatformLog.h"
-#include "platform/linux/FileDeviceLockState.h"
-#include "platform/linux/LinuxPasswordDatabase.h"
-#include "platform/linux/SemaphoreBootMarker.h"
-#include "platform/linux/SystemRoot.h"
-#include "platform/linux/XattrProtectionClass.h"
 #include "store/StorePlaces.h"
 
 #include <expected>

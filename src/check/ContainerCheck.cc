@@ -1,14 +1,14 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "check/ContainerCheck.h"
 
+#include "base/UserIdentity.h"
 #include "check/ShellText.h"
-#include "daemon/base/UserIdentity.h"
 #include "fs/AtomicFile.h"
 #include "fs/ItemStatus.h"
 #include "fs/LeftoverNames.h"
 #include "ipc/Keys.h"
-#include "platform/linux/Names.h"
-#include "platform/linux/Openat2.h"
+#include "os/Names.h"
+#include "os/Openat2.h"
 #include "store/Names.h"
 #include "store/ZORGlobalConfiguration.h"
 

@@ -4,8 +4,8 @@
 #pragma once
 
 #include "check/Look.h"
+#include "store/ContainerLayout.h"
 #include "store/ZORMetadata.h"
-#include "store/operations/ContainerLayout.h"
 
 #include <map>
 #include <memory>

@@ -2,9 +2,9 @@
 // One thing that is wrong with a store, as a check found it.
 #pragma once
 
+#include "base/ContainerClass.h"
+#include "base/UUID.h"
 #include "check/FindingCode.h"
-#include "daemon/base/ContainerClass.h"
-#include "daemon/base/UUID.h"
 
 #include <cstdint>
 #include <optional>

@@ -1,10 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "check/Look.h"
 
-#include "daemon/base/UserIdentity.h"
+#include "base/UserIdentity.h"
 #include "fs/BulkDirectoryRead.h"
 #include "fs/Hidden.h"
-#include "platform/linux/Names.h"
+#include "os/Names.h"
 #include "store/Names.h"
 #include "store/UserHome.h"
 

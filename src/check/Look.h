@@ -7,8 +7,8 @@
 #include "check/Finding.h"
 #include "check/ShellText.h"
 #include "check/StoreCheck.h"
-#include "entitlements/ZORWhitelist.h"
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
+#include "store/ZORWhitelist.h"
 
 #include <functional>
 #include <map>

@@ -3,8 +3,8 @@
 // daemon does.
 #pragma once
 
+#include "os/HiddenNames.h"
 #include "platform/Disk.h"
-#include "platform/linux/HiddenNames.h"
 
 #include <cerrno>
 

@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "check/ReferenceCheck.h"
 
-#include "daemon/base/UserIdentity.h"
-#include "entitlements/EntitlementFile.h"
+#include "base/UserIdentity.h"
+#include "store/EntitlementFile.h"
 
 #include <algorithm>
 #include <cerrno>

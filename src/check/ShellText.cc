@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "check/ShellText.h"
 
-#include "daemon/base/Log.h"
+#include "base/Log.h"
 
 namespace zor::check {
 

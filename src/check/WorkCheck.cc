@@ -1,14 +1,14 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "check/WorkCheck.h"
 
+#include "base/PercentEncoding.h"
+#include "device/SandboxLinks.h"
 #include "fs/AtomicFile.h"
 #include "fs/FileSystemDeathRow.h"
 #include "fs/LeftoverNames.h"
-#include "platform/PercentEncoding.h"
-#include "platform/linux/DirectoryNames.h"
-#include "platform/linux/Names.h"
-#include "platform/linux/SandboxLinks.h"
-#include "store/operations/ReplaceJournal.h"
+#include "os/DirectoryNames.h"
+#include "os/Names.h"
+#include "store/ReplaceJournal.h"
 
 #include <ctime>
 #include <fcntl.h>

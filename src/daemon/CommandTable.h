@@ -2,11 +2,11 @@
 // The commands that a client may send: which entitlement each needs, who handles it, and who sends the reply.
 #pragma once
 
-#include "daemon/ZORClientConnection.h"
-#include "daemon/base/UserIdentity.h"
+#include "base/UserIdentity.h"
 #include "ipc/Keys.h"
+#include "operations/StoreServices.h"
+#include "operations/ZORClientConnection.h"
 #include "platform/ServiceListener.h"
-#include "store/StoreServices.h"
 
 #include <array>
 #include <memory>

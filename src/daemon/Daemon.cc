@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/Daemon.h"
 
-#include "platform/linux/Names.h"
+#include "os/Names.h"
 
 namespace zor {
 

@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/Dispatcher.h"
 
-#include "entitlements/ZOREntitlementMapping.h"
+#include "base/EntitlementKeys.h"
 #include "ipc/Identifier.h"
-#include "platform/EntitlementKeys.h"
+#include "operations/ZOREntitlementMapping.h"
 
 #include <algorithm>
 

@@ -5,10 +5,10 @@
 // peer between messages. Messages of one connection come one at a time, those of different ones in parallel.
 #pragma once
 
+#include "base/UserIdentity.h"
 #include "daemon/CommandTable.h"
-#include "daemon/base/UserIdentity.h"
+#include "operations/StoreServices.h"
 #include "platform/ServiceListener.h"
-#include "store/StoreServices.h"
 
 #include <atomic>
 #include <cstdint>

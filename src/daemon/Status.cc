@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/Status.h"
 
+#include "base/EntitlementKeys.h"
 #include "ipc/Keys.h"
-#include "platform/EntitlementKeys.h"
-#include "protection/ZORDataProtectionManager.h"
+#include "operations/ZORDataProtectionManager.h"
 
 namespace zor {
 

@@ -5,8 +5,8 @@
 
 #include "daemon/Composition.h"
 #include "platform/PeerIdentity.h"
-#include "platform/linux/StatusSocket.h"
 #include "plist/Value.h"
+#include "service/StatusSocket.h"
 
 #include <functional>
 

@@ -2,14 +2,14 @@
 // zorvaned: the options, the platform, the services over it, then the daemon's life until it is told to stop.
 #include "daemon/Composition.h"
 #include "daemon/Daemon.h"
+#include "daemon/LinuxPlatform.h"
 #include "daemon/Options.h"
 #include "daemon/Status.h"
-#include "platform/linux/LinuxPlatform.h"
-#include "platform/linux/Names.h"
-#include "platform/linux/NotifySocket.h"
-#include "platform/linux/SignalDescriptor.h"
-#include "platform/linux/StandardDescriptors.h"
-#include "platform/linux/StatusSocket.h"
+#include "os/Names.h"
+#include "os/NotifySocket.h"
+#include "os/SignalDescriptor.h"
+#include "os/StandardDescriptors.h"
+#include "service/StatusSocket.h"
 
 #include <atomic>
 #include <csignal>

@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/AtomicFile.h"
 
-#include "platform/FileDescriptor.h"
-#include "platform/linux/Openat2.h"
+#include "os/FileDescriptor.h"
+#include "os/Openat2.h"
 
 #include <cerrno>
 #include <fcntl.h>

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/BoundedQuestion.h"
 
-#include "platform/BlockingScope.h"
+#include "base/BlockingScope.h"
 
 #include <system_error>
 #include <thread>

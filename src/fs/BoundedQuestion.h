@@ -6,7 +6,7 @@
 // along, which has to outlive nothing: it may still wait when the process ends.
 #pragma once
 
-#include "platform/Mutex.h"
+#include "base/Mutex.h"
 
 #include <chrono>
 #include <functional>

@@ -3,7 +3,7 @@
 
 #include "fs/AtomicFile.h"
 #include "fs/OwnedFile.h"
-#include "platform/linux/Openat2.h"
+#include "os/Openat2.h"
 #include "plist/Binary.h"
 #include "plist/Read.h"
 

@@ -2,8 +2,8 @@
 // Dictionaries on disk and the string helpers that go with paths.
 #pragma once
 
-#include "daemon/base/FileURL.h"
-#include "daemon/base/Result.h"
+#include "base/FileURL.h"
+#include "base/Result.h"
 #include "fs/ZORFileManager.h"
 #include "plist/Value.h"
 

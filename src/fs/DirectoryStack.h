@@ -11,7 +11,7 @@
 #pragma once
 
 #include "fs/BulkDirectoryRead.h"
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 
 #include <array>
 #include <cstdint>

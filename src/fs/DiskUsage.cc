@@ -1,12 +1,12 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/DiskUsage.h"
 
-#include "daemon/base/Log.h"
-#include "daemon/base/ZORError.h"
+#include "base/Log.h"
+#include "base/ZORError.h"
 #include "fs/BulkDirectoryRead.h"
 #include "fs/ItemStatus.h"
 #include "fs/TreeWalker.h"
-#include "platform/linux/Openat2.h"
+#include "os/Openat2.h"
 
 #include <cerrno>
 #include <climits>

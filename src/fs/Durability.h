@@ -14,8 +14,8 @@
 // Which kind a directory lies on is asked once for each device. Any thread.
 #pragma once
 
+#include "base/Mutex.h"
 #include "platform/Disk.h"
-#include "platform/Mutex.h"
 
 #include <map>
 #include <sys/types.h>

@@ -2,7 +2,7 @@
 #include "fs/FileSystemDeathRow.h"
 
 #include "fs/LeftoverNames.h"
-#include "platform/linux/Openat2.h"
+#include "os/Openat2.h"
 
 #include <cerrno>
 #include <fcntl.h>

@@ -3,7 +3,7 @@
 // name that there is none. Asked only where a name was not found, so what is found costs nothing. Any thread.
 #pragma once
 
-#include "daemon/base/FileURL.h"
+#include "base/FileURL.h"
 #include "fs/PathResolver.h"
 #include "platform/Disk.h"
 

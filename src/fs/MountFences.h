@@ -13,10 +13,10 @@
 // Changes nothing on the disk. Any thread; fences are added, never taken away.
 #pragma once
 
+#include "base/Mutex.h"
 #include "fs/BoundedQuestion.h"
 #include "fs/ItemStatus.h"
-#include "platform/FileDescriptor.h"
-#include "platform/Mutex.h"
+#include "os/FileDescriptor.h"
 
 #include <atomic>
 #include <chrono>

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/OwnedFile.h"
 
-#include "platform/linux/Openat2.h"
+#include "os/Openat2.h"
 
 #include <cerrno>
 #include <fcntl.h>

@@ -8,11 +8,11 @@
 // descriptor or an errno. Any thread.
 #pragma once
 
-#include "daemon/base/FileURL.h"
+#include "base/FileURL.h"
 #include "fs/MountFences.h"
+#include "os/FileDescriptor.h"
+#include "os/SystemRoot.h"
 #include "platform/Disk.h"
-#include "platform/FileDescriptor.h"
-#include "platform/linux/SystemRoot.h"
 
 #include <cstdint>
 #include <functional>

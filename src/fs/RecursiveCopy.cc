@@ -9,7 +9,7 @@
 #include "fs/FreshDirectory.h"
 #include "fs/RecursiveRemove.h"
 #include "fs/TreeWalker.h"
-#include "platform/linux/Openat2.h"
+#include "os/Openat2.h"
 
 #include <array>
 #include <cerrno>

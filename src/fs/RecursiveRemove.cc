@@ -3,7 +3,7 @@
 
 #include "fs/ItemStatus.h"
 #include "fs/TreeWalker.h"
-#include "platform/linux/Openat2.h"
+#include "os/Openat2.h"
 
 #include <algorithm>
 #include <cerrno>

@@ -2,7 +2,7 @@
 #include "fs/TreeWalker.h"
 
 #include "fs/ItemStatus.h"
-#include "platform/linux/Openat2.h"
+#include "os/Openat2.h"
 
 #include <cerrno>
 #include <dirent.h>

@@ -6,7 +6,7 @@
 #include "fs/FreshDirectory.h"
 #include "fs/Hidden.h"
 #include "fs/ItemStatus.h"
-#include "platform/linux/Openat2.h"
+#include "os/Openat2.h"
 
 #include <cerrno>
 #include <fcntl.h>

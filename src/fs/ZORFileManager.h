@@ -11,14 +11,14 @@
 // thing.
 #pragma once
 
-#include "daemon/base/FileURL.h"
-#include "daemon/base/Result.h"
+#include "base/FileURL.h"
+#include "base/Mutex.h"
+#include "base/Result.h"
 #include "fs/DiskUsage.h"
 #include "fs/PathResolver.h"
 #include "fs/TreeWalker.h"
 #include "platform/Disk.h"
 #include "platform/FileProtectionClass.h"
-#include "platform/Mutex.h"
 #include "plist/Value.h"
 
 #include <atomic>

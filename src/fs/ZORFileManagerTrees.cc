@@ -11,7 +11,7 @@
 #include "fs/RecursiveCopy.h"
 #include "fs/RecursiveRemove.h"
 #include "fs/ZORFileManager.h"
-#include "platform/linux/Openat2.h"
+#include "os/Openat2.h"
 
 #include <cerrno>
 #include <dirent.h>

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// The daemon's log file: where lines go, not which lines are written (daemon/base/Log.h gates by level).
+// The daemon's log file: where lines go, not which lines are written (base/Log.h gates by level).
 #pragma once
 
 #include <cstddef>

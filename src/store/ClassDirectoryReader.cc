@@ -1,10 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ClassDirectoryReader.h"
 
+#include "base/Mutex.h"
 #include "fs/BulkDirectoryRead.h"
 #include "fs/Hidden.h"
 #include "fs/Stretches.h"
-#include "platform/Mutex.h"
 
 #include <cerrno>
 #include <iterator>

@@ -5,7 +5,7 @@
 // A pass writes it, on the death-row queue; anybody reads it.
 #pragma once
 
-#include "platform/Mutex.h"
+#include "base/Mutex.h"
 
 #include <cstddef>
 #include <cstdint>

@@ -5,7 +5,7 @@
 // Used by the thread that starts the daemon, before anything is served; passes() is read afterwards.
 #pragma once
 
-#include "daemon/base/ZORException.h"
+#include "base/ZORException.h"
 
 #include <chrono>
 #include <cstdint>

@@ -6,8 +6,8 @@
 // Immutable after it is made; any thread.
 #pragma once
 
-#include "daemon/base/ContainerClass.h"
-#include "daemon/base/FileURL.h"
+#include "base/ContainerClass.h"
+#include "base/FileURL.h"
 #include "fs/PathResolver.h"
 
 #include <optional>

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/UserHome.h"
 
-#include "daemon/base/ZORError.h"
+#include "base/ZORError.h"
 
 #include <cerrno>
 #include <climits>

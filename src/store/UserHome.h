@@ -9,11 +9,11 @@
 // no way into the home crosses a mount. Any thread.
 #pragma once
 
-#include "daemon/base/FileURL.h"
-#include "daemon/base/Log.h"
+#include "base/FileURL.h"
+#include "base/Log.h"
+#include "base/Mutex.h"
 #include "fs/BoundedQuestion.h"
 #include "fs/PathResolver.h"
-#include "platform/Mutex.h"
 #include "platform/Queries.h"
 
 #include <atomic>

@@ -7,8 +7,8 @@
 // the next launch reads the journals.
 #pragma once
 
-#include "daemon/base/FileURL.h"
-#include "platform/Mutex.h"
+#include "base/FileURL.h"
+#include "base/Mutex.h"
 
 #include <atomic>
 #include <vector>

@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ZORContainerCache.h"
 
-#include "daemon/base/UserIdentity.h"
+#include "base/BlockingScope.h"
+#include "base/UserIdentity.h"
 #include "fs/Hidden.h"
-#include "platform/BlockingScope.h"
 #include "plist/HeldBytes.h"
 #include "store/ClassDirectoryReader.h"
 #include "store/Names.h"

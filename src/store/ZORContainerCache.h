@@ -14,11 +14,11 @@
 // operations (code 40).
 #pragma once
 
-#include "daemon/base/ContainerClass.h"
-#include "daemon/base/Result.h"
-#include "daemon/base/ZORException.h"
+#include "base/ContainerClass.h"
+#include "base/Mutex.h"
+#include "base/Result.h"
+#include "base/ZORException.h"
 #include "fs/Durability.h"
-#include "platform/Mutex.h"
 #include "store/ZORGlobalConfiguration.h"
 #include "store/ZORMetadata.h"
 

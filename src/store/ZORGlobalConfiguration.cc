@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ZORGlobalConfiguration.h"
 
-#include "daemon/base/UserIdentity.h"
+#include "base/UserIdentity.h"
 #include "ipc/ContainerClasses.h"
 #include "store/Names.h"
 

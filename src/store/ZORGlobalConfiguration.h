@@ -8,10 +8,10 @@
 // then only that user's own.
 #pragma once
 
-#include "daemon/base/ContainerClass.h"
-#include "daemon/base/FileURL.h"
+#include "base/ContainerClass.h"
+#include "base/FileURL.h"
+#include "base/Mutex.h"
 #include "fs/ZORFileManager.h"
-#include "platform/Mutex.h"
 #include "platform/Queries.h"
 #include "store/StorePlaces.h"
 #include "store/UserHome.h"

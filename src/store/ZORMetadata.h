@@ -8,10 +8,10 @@
 // directory name that is a UUID is kept as its 16 bytes.
 #pragma once
 
-#include "daemon/base/ContainerClass.h"
-#include "daemon/base/FileURL.h"
-#include "daemon/base/Result.h"
-#include "daemon/base/UUID.h"
+#include "base/ContainerClass.h"
+#include "base/FileURL.h"
+#include "base/Result.h"
+#include "base/UUID.h"
 #include "fs/ZORFileManager.h"
 #include "plist/Value.h"
 

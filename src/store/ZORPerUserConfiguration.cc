@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ZORPerUserConfiguration.h"
 
-#include "daemon/base/UserIdentity.h"
+#include "base/UserIdentity.h"
 #include "store/StorePlaces.h"
 
 namespace zor {

@@ -6,10 +6,10 @@
 // Its own recursive lock is held for a whole getter. Lock order: the global configuration's lock before this one.
 #pragma once
 
-#include "daemon/base/ContainerClass.h"
-#include "daemon/base/FileURL.h"
+#include "base/ContainerClass.h"
+#include "base/FileURL.h"
+#include "base/Mutex.h"
 #include "fs/ZORFileManager.h"
-#include "platform/Mutex.h"
 #include "store/UserHome.h"
 
 #include <memory>

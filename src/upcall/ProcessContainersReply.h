@@ -2,7 +2,7 @@
 // The containers of a process, as the kernel is told of them.
 #pragma once
 
-#include "daemon/base/Log.h"
+#include "base/Log.h"
 #include "upcall/packbuff/Packbuff.h"
 
 #include <map>

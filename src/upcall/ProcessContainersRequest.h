@@ -3,7 +3,7 @@
 // taken for hostile.
 #pragma once
 
-#include "daemon/base/Log.h"
+#include "base/Log.h"
 #include "upcall/packbuff/Packbuff.h"
 #include "upcall/packbuff/UpcallMessage.h"
 

@@ -1,11 +1,11 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "upcall/UpcallServer.h"
 
-#include "daemon/ZORClientConnection.h"
-#include "daemon/base/UserIdentity.h"
+#include "base/UserIdentity.h"
+#include "operations/StoreServices.h"
+#include "operations/ZORClientConnection.h"
 #include "plist/Value.h"
 #include "store/Names.h"
-#include "store/StoreServices.h"
 
 #include <cerrno>
 #include <new>

@@ -9,7 +9,7 @@
 // packets. No packet can end the daemon: what is thrown ends at this class.
 #pragma once
 
-#include "daemon/base/Result.h"
+#include "base/Result.h"
 #include "platform/UpcallPort.h"
 #include "upcall/ProcessContainersReply.h"
 #include "upcall/ProcessContainersRequest.h"

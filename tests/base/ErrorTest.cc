@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // Error values and their one line, the level gate, the limit on provoked lines, and the boundary where exceptions end.
-#include "daemon/base/ZORException.h"
-#include "platform/linux/FileCrashAnnotation.h"
-#include "platform/linux/LinuxDisk.h"
-#include "platform/linux/Names.h"
+#include "base/ZORException.h"
+#include "device/FileCrashAnnotation.h"
+#include "os/LinuxDisk.h"
+#include "os/Names.h"
 #include "support/FileTree.h"
 #include "support/RecordingLog.h"
 

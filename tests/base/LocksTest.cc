@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // The identifier locks: who waits for whom, in which order several are taken, what misuse does; a load over all modes
 // in which plain variables are guarded by nothing else, for ThreadSanitizer to judge.
-#include "daemon/base/ZORLocks.h"
+#include "base/ZORLocks.h"
 #include "support/Allocations.h"
 #include "support/RecordingLog.h"
 

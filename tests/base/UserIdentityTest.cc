@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Whose containers a request may act on, as tables over every class; the lookup of the mobile user by many threads at
 // once.
-#include "daemon/base/UserIdentity.h"
+#include "base/UserIdentity.h"
 #include "support/RecordingLog.h"
 
 #include <atomic>

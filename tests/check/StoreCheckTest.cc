@@ -2,7 +2,7 @@
 #include "check/StoreCheck.h"
 #include "check/Repair.h"
 #include "check/ShellText.h"
-#include "entitlements/EntitlementFile.h"
+#include "store/EntitlementFile.h"
 #include "support/EncryptedDisk.h"
 #include "support/FileTree.h"
 #include "world/World.h"

@@ -4,7 +4,7 @@
 #include "ipc/Frame.h"
 #include "ipc/Keys.h"
 #include "ipc/Uuid.h"
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 #include "plist/Binary.h"
 #include "zorvane/Text.h"
 

@@ -6,7 +6,7 @@
 #include "content/ItemRules.h"
 #include "content/Powerless.h"
 #include "content/Unpacker.h"
-#include "platform/linux/LinuxDisk.h"
+#include "os/LinuxDisk.h"
 #include "support/FaultLoop.h"
 #include "support/FileTree.h"
 #include "support/LongRun.h"

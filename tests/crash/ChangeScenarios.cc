@@ -2,7 +2,7 @@
 // Scenarios in which a container that is there changes: replaced, wiped, mended, renamed, given a value.
 #include "crash/Scenarios.h"
 
-#include "store/operations/ReplaceJournal.h"
+#include "store/ReplaceJournal.h"
 #include "support/Files.h"
 
 #include <filesystem>

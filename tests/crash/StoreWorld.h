@@ -7,8 +7,8 @@
 #pragma once
 
 #include "daemon/Composition.h"
-#include "platform/linux/LinuxDisk.h"
-#include "platform/linux/LinuxPlatform.h"
+#include "daemon/LinuxPlatform.h"
+#include "os/LinuxDisk.h"
 #include "support/RecordingLog.h"
 #include "support/StoreJudge.h"
 

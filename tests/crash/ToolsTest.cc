@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Goal: the tools that inject faults and cut the power tell what is sound from what is wrong. Method: small ways to
 // change a disk, some known to be wrong.
-#include "platform/linux/LinuxDisk.h"
+#include "os/LinuxDisk.h"
 #include "support/FaultLoop.h"
 #include "support/Files.h"
 #include "support/PowerCut.h"

@@ -3,9 +3,9 @@
 // state.
 #pragma once
 
+#include "device/XattrProtectionClass.h"
 #include "fs/ZORFileManager.h"
-#include "platform/linux/LinuxDisk.h"
-#include "platform/linux/XattrProtectionClass.h"
+#include "os/LinuxDisk.h"
 #include "support/FaultDisk.h"
 #include "support/FileTree.h"
 #include "support/Files.h"

@@ -3,7 +3,7 @@
 // change, and an owner of the tree who moves it about meanwhile.
 #pragma once
 
-#include "platform/linux/LinuxDisk.h"
+#include "os/LinuxDisk.h"
 #include "support/FileTree.h"
 #include "support/Files.h"
 #include "support/LongRun.h"

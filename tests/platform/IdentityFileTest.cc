@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "platform/linux/IdentityFile.h"
-#include "platform/linux/CgroupUnit.h"
+#include "identity/IdentityFile.h"
+#include "identity/CgroupUnit.h"
 
 #include <gtest/gtest.h>
 

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Peers are real processes that run copies of real programs; the registry is files in a root of the test's own.
+#include "os/EpollRunLoop.h"
 #include "platform/PeerProcess.h"
-#include "platform/linux/EpollRunLoop.h"
 #include "support/ProcessResources.h"
 
 #include <algorithm>

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "platform/linux/LinuxPlatform.h"
+#include "daemon/LinuxPlatform.h"
 #include "platform/TestRoot.h"
 #include "support/ProcessResources.h"
 

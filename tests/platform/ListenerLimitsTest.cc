@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "platform/ListenerWorld.h"
-#include "platform/linux/ListenerCharges.h"
+#include "service/ListenerCharges.h"
 #include "support/ProcessResources.h"
 
 #include <algorithm>

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "platform/BlockingScope.h"
+#include "base/BlockingScope.h"
 #include "platform/ListenerWorld.h"
 #include "support/LongRun.h"
 

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
+#include "os/EpollRunLoop.h"
 #include "platform/ListenerWorld.h"
-#include "platform/linux/EpollRunLoop.h"
-#include "platform/linux/StatusSocket.h"
+#include "service/StatusSocket.h"
 #include "support/ProcessResources.h"
 
 #include <sys/socket.h>

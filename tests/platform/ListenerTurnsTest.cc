@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // Turns go by user. Users are uids that this test takes while it connects, so it needs root.
-#include "platform/BlockingScope.h"
+#include "base/BlockingScope.h"
 #include "platform/ListenerWorld.h"
 
 #include <semaphore>

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // What the listener does when there is no thread or no descriptor left.
-#include "platform/BlockingScope.h"
+#include "base/BlockingScope.h"
 #include "platform/ListenerWorld.h"
 #include "support/FileTree.h"
 

@@ -5,8 +5,8 @@
 
 #include "ipc/Frame.h"
 #include "platform/TestRoot.h"
-#include "platform/linux/LinuxServiceListener.h"
 #include "plist/Binary.h"
+#include "service/LinuxServiceListener.h"
 
 #include <algorithm>
 #include <atomic>

@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "platform/RefusalLimiter.h"
+#include "daemon/RefusalLimiter.h"
+#include "os/LogLine.h"
+#include "os/RotatingLog.h"
 #include "platform/TestRoot.h"
-#include "platform/linux/LogLine.h"
-#include "platform/linux/RotatingLog.h"
 #include "plist/EscapedText.h"
 
 #include <csignal>

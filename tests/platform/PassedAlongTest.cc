@@ -2,9 +2,9 @@
 // What peers pass along with their bytes holds no thread: neither one that receives it, nor one that closes the socket
 // in which it lies unread. Method: TCP sockets that linger for twenty seconds, because nobody reads at their far end.
 // They are sent before the listening socket comes to the listener; after that newer kernels refuse them.
+#include "os/EpollRunLoop.h"
 #include "platform/ListenerWorld.h"
-#include "platform/linux/EpollRunLoop.h"
-#include "platform/linux/StatusSocket.h"
+#include "service/StatusSocket.h"
 #include "support/FileTree.h"
 #include "support/ProcessResources.h"
 

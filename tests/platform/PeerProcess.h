@@ -2,10 +2,10 @@
 // Real processes that connect to a socket, and the registry that they are judged by.
 #pragma once
 
-#include "platform/FileDescriptor.h"
+#include "identity/LinuxPeerIdentity.h"
+#include "os/FileDescriptor.h"
+#include "os/Names.h"
 #include "platform/TestRoot.h"
-#include "platform/linux/LinuxPeerIdentity.h"
-#include "platform/linux/Names.h"
 #include "support/RecordingLog.h"
 
 #include <csignal>

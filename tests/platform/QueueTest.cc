@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
+#include "os/EpollRunLoop.h"
+#include "os/SerialWorkQueue.h"
+#include "os/SignalDescriptor.h"
 #include "platform/TestRoot.h"
-#include "platform/linux/EpollRunLoop.h"
-#include "platform/linux/SerialWorkQueue.h"
-#include "platform/linux/SignalDescriptor.h"
 
 #include <algorithm>
 #include <atomic>

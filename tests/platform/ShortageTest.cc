@@ -1,15 +1,15 @@
 // SPDX-License-Identifier: Apache-2.0
 // A process without descriptors, or without memory: what it could not look at it does not take for absent, and what one
 // client's request lacked ends that client's connection and nothing else.
-#include "platform/BlockingScope.h"
+#include "base/BlockingScope.h"
+#include "device/FileDeviceLockState.h"
+#include "os/EpollRunLoop.h"
+#include "os/Names.h"
 #include "platform/ListenerWorld.h"
 #include "platform/PeerProcess.h"
-#include "platform/linux/EpollRunLoop.h"
-#include "platform/linux/FileDeviceLockState.h"
-#include "platform/linux/ListenerPool.h"
-#include "platform/linux/Names.h"
-#include "platform/linux/SeqpacketUpcallPort.h"
-#include "platform/linux/StatusSocket.h"
+#include "service/ListenerPool.h"
+#include "service/SeqpacketUpcallPort.h"
+#include "service/StatusSocket.h"
 #include "support/Allocations.h"
 #include "support/FewDescriptors.h"
 

@@ -1,10 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
+#include "os/EpollRunLoop.h"
+#include "os/Names.h"
+#include "os/NotifySocket.h"
 #include "platform/ListenerWorld.h"
-#include "platform/linux/EpollRunLoop.h"
-#include "platform/linux/Names.h"
-#include "platform/linux/NotifySocket.h"
-#include "platform/linux/PassedSockets.h"
-#include "platform/linux/SeqpacketUpcallPort.h"
+#include "service/PassedSockets.h"
+#include "service/SeqpacketUpcallPort.h"
 #include "support/ProcessResources.h"
 
 #include <algorithm>

@@ -2,8 +2,8 @@
 // A system root of a test's own, and short ways to put files into it.
 #pragma once
 
-#include "platform/linux/LinuxDisk.h"
-#include "platform/linux/SystemRoot.h"
+#include "os/LinuxDisk.h"
+#include "os/SystemRoot.h"
 #include "support/FileTree.h"
 
 #include <chrono>

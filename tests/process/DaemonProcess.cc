@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "process/DaemonProcess.h"
 
-#include "platform/linux/SemaphoreBootMarker.h"
-#include "platform/linux/SystemRoot.h"
+#include "device/SemaphoreBootMarker.h"
+#include "os/SystemRoot.h"
 
 #include <chrono>
 #include <csignal>

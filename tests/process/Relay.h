@@ -4,7 +4,7 @@
 #pragma once
 
 #include "ipc/Keys.h"
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 #include "process/DaemonProcess.h"
 
 #include <functional>

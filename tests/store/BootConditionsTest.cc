@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Conditions that a boot may meet, and what they may not cost: each row is a device, one boot or more over it, and a
 // look at what has to be there afterwards.
-#include "entitlements/ZOREntitlementMapping.h"
+#include "operations/ZOREntitlementMapping.h"
 #include "platform/ServiceListener.h"
 #include "support/EncryptedDisk.h"
 #include "world/World.h"

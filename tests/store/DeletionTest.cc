@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Taking containers out of the store: what a batch stages and says, what goes with each class, disks that refuse, and
 // owners who swap what is to be deleted.
-#include "entitlements/ZOREntitlementMapping.h"
+#include "operations/ZOREntitlementMapping.h"
 #include "world/World.h"
 
 #include <atomic>

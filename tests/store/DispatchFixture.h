@@ -2,7 +2,7 @@
 // Messages to the dispatcher of a world, from a peer whose identity is in the test's hand.
 #pragma once
 
-#include "platform/EntitlementKeys.h"
+#include "base/EntitlementKeys.h"
 #include "world/World.h"
 
 #include <chrono>

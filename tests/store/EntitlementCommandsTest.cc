@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Deletion, entitlements and shared containers from a request's keys to a reply's, and the registration of a peer by
 // its own messages.
-#include "entitlements/ZOREntitlementMapping.h"
+#include "operations/ZOREntitlementMapping.h"
 #include "store/DispatchFixture.h"
 
 #include <set>

@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // Changing the data-protection class of a container: what is judged, what is set where, what waits for an unlock, and
 // what happens to the container meanwhile.
-#include "protection/ZORApplicationTerminationAssertion.h"
-#include "protection/ZORDataProtectionChangeOperation.h"
-#include "protection/ZORDataProtectionManager.h"
+#include "operations/ZORApplicationTerminationAssertion.h"
+#include "operations/ZORDataProtectionChangeOperation.h"
+#include "operations/ZORDataProtectionManager.h"
 #include "support/LongRun.h"
 #include "support/OpenWatch.h"
 #include "world/World.h"

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // What becomes of another's directory that is renamed to a name which the daemon wants: whoever may write the directory
 // above can do that, also where he may not look inside.
-#include "store/operations/ReplaceJournal.h"
+#include "store/ReplaceJournal.h"
 #include "world/World.h"
 
 #include <fcntl.h>

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "support/EncryptedDisk.h"
 
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 
 #include <cerrno>
 #include <cstdlib>

@@ -9,7 +9,7 @@
 // stack unwinds (destructors may not throw), returns -EIO.
 #pragma once
 
-#include "platform/Mutex.h"
+#include "base/Mutex.h"
 #include "support/InterceptedDisk.h"
 
 #include <cerrno>

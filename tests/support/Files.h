@@ -3,7 +3,7 @@
 // the open directory `parent` and may have directories in it.
 #pragma once
 
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 
 #include <cerrno>
 #include <cstdint>

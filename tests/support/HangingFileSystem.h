@@ -2,7 +2,7 @@
 // A file system (FUSE) that its server never answers for, as any user may mount one where fusermount lets him.
 #pragma once
 
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 
 #include <string>
 #include <sys/types.h>

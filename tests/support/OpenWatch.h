@@ -2,7 +2,7 @@
 // Acts in the very moment in which a file or directory is opened for reading, as one whom root lets watch it may.
 #pragma once
 
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 
 #include <fcntl.h>
 #include <functional>

@@ -7,7 +7,7 @@
 // made one at a time, so that the log's order is the disk's. Any thread.
 #pragma once
 
-#include "platform/Mutex.h"
+#include "base/Mutex.h"
 #include "support/FileTree.h"
 #include "support/InterceptedDisk.h"
 

@@ -3,7 +3,7 @@
 
 #include "daemon/Daemon.h"
 #include "ipc/Names.h"
-#include "platform/linux/Names.h"
+#include "os/Names.h"
 
 #include <fcntl.h>
 #include <filesystem>

@@ -3,7 +3,7 @@
 // does: the test's own program is registered as that agent.
 #pragma once
 
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 #include "platform/UpcallPort.h"
 #include "upcall/PackbuffWorld.h"
 #include "upcall/packbuff/Packbuff.h"

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // The daemon's life as its users see it: killed at any moment, started twice, told to stop, asked by its tool.
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 #include "process/DaemonProcess.h"
 #include "process/Relay.h"
 #include "support/LongRun.h"

@@ -9,8 +9,8 @@
 #pragma once
 
 #include "daemon/Composition.h"
-#include "platform/linux/LinuxDisk.h"
-#include "platform/linux/LinuxPlatform.h"
+#include "daemon/LinuxPlatform.h"
+#include "os/LinuxDisk.h"
 #include "store/Names.h"
 #include "support/FaultDisk.h"
 #include "support/FileTree.h"

@@ -3,7 +3,7 @@
 #pragma once
 
 #include "Options.h"
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 
 #include <string>
 

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Fence.h"
 
-#include "platform/linux/SystemCallFilter.h"
+#include "os/SystemCallFilter.h"
 
 #include <asm/ioctls.h>
 #include <cerrno>

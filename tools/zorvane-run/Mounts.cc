@@ -2,8 +2,8 @@
 #include "Mounts.h"
 
 #include "fs/MountFences.h"
-#include "platform/linux/HiddenNames.h"
-#include "platform/linux/Openat2.h"
+#include "os/HiddenNames.h"
+#include "os/Openat2.h"
 
 #include <algorithm>
 #include <cerrno>

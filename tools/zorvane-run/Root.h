@@ -3,7 +3,7 @@
 #pragma once
 
 #include "Failure.h"
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 
 namespace zorvanerun {
 

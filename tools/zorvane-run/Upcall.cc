@@ -2,7 +2,7 @@
 #include "Upcall.h"
 
 #include "ipc/Names.h"
-#include "platform/linux/Openat2.h"
+#include "os/Openat2.h"
 
 #include <algorithm>
 #include <cerrno>

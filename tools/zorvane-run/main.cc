@@ -12,7 +12,7 @@
 #include "Registered.h"
 #include "Supervisor.h"
 #include "Upcall.h"
-#include "platform/linux/StandardDescriptors.h"
+#include "os/StandardDescriptors.h"
 
 #include <algorithm>
 #include <csignal>

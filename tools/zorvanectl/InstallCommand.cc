@@ -15,7 +15,7 @@
 #include "ProgressDisplay.h"
 #include "content/ContainerDirectory.h"
 #include "content/Content.h"
-#include "platform/linux/LinuxDisk.h"
+#include "os/LinuxDisk.h"
 
 #include <algorithm>
 #include <csignal>

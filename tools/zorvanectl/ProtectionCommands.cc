@@ -3,12 +3,12 @@
 #include "Commands.h"
 #include "KnownContainer.h"
 #include "PendingChanges.h"
-#include "platform/FileDescriptor.h"
-#include "platform/linux/FileDeviceLockState.h"
-#include "platform/linux/Names.h"
-#include "platform/linux/Openat2.h"
-#include "platform/linux/SystemRoot.h"
-#include "platform/linux/XattrProtectionClass.h"
+#include "device/FileDeviceLockState.h"
+#include "device/XattrProtectionClass.h"
+#include "os/FileDescriptor.h"
+#include "os/Names.h"
+#include "os/Openat2.h"
+#include "os/SystemRoot.h"
 
 #include <cerrno>
 #include <cstring>

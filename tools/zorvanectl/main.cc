@@ -3,7 +3,7 @@
 // the public client library.
 #include "Commands.h"
 #include "Output.h"
-#include "platform/linux/StandardDescriptors.h"
+#include "os/StandardDescriptors.h"
 
 #include <CLI/CLI.hpp>
 #include <algorithm>

@@ -1,11 +1,11 @@
 // SPDX-License-Identifier: Apache-2.0
 // How a process finds the containers it shares, and how an installer registers what an identifier is entitled to.
-#include "daemon/base/UserIdentity.h"
+#include "base/UserIdentity.h"
 #include "daemon/commands/Commands.h"
 #include "daemon/commands/Request.h"
-#include "entitlements/ZOREntitlementMapping.h"
-#include "entitlements/ZORGroupManager.h"
-#include "entitlements/ZORWhitelist.h"
+#include "operations/ZOREntitlementMapping.h"
+#include "operations/ZORGroupManager.h"
+#include "store/ZORWhitelist.h"
 
 #include <algorithm>
 

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // Replacing, repairing, wiping and measuring containers.
-#include "daemon/base/UserIdentity.h"
+#include "base/UserIdentity.h"
 #include "daemon/commands/Commands.h"
 #include "daemon/commands/Request.h"
 

@@ -2,7 +2,7 @@
 // Changing the data-protection class of a container. It replies itself, when the change has ended.
 #include "daemon/commands/Commands.h"
 #include "daemon/commands/Request.h"
-#include "protection/ZORDataProtectionManager.h"
+#include "operations/ZORDataProtectionManager.h"
 
 namespace zor::commands {
 

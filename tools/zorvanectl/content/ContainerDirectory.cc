@@ -3,7 +3,7 @@
 
 #include "fs/MetadataFileName.h"
 #include "fs/OwnedFile.h"
-#include "platform/linux/Openat2.h"
+#include "os/Openat2.h"
 
 #include <fcntl.h>
 

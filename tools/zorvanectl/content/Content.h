@@ -12,8 +12,8 @@
 #include "Course.h"
 #include "Failure.h"
 #include "Holders.h"
+#include "os/FileDescriptor.h"
 #include "platform/Disk.h"
-#include "platform/FileDescriptor.h"
 
 #include <csignal>
 #include <functional>

@@ -10,7 +10,7 @@
 #pragma once
 
 #include "Failure.h"
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 
 #include <sys/types.h>
 

@@ -9,7 +9,7 @@
 #pragma once
 
 #include "Failure.h"
-#include "platform/FileDescriptor.h"
+#include "os/FileDescriptor.h"
 
 #include <cstddef>
 #include <optional>

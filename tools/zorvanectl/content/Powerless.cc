@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Powerless.h"
 
-#include "platform/linux/SystemCallFilter.h"
+#include "os/SystemCallFilter.h"
 
 #include <csignal>
 #include <grp.h>

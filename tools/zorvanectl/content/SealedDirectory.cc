@@ -4,7 +4,7 @@
 #include "fs/BulkDirectoryRead.h"
 #include "fs/FreshDirectory.h"
 #include "fs/RecursiveRemove.h"
-#include "platform/linux/Openat2.h"
+#include "os/Openat2.h"
 #include "zorvane/Text.h"
 
 #include <array>

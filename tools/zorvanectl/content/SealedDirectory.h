@@ -11,8 +11,8 @@
 #pragma once
 
 #include "Failure.h"
+#include "os/FileDescriptor.h"
 #include "platform/Disk.h"
-#include "platform/FileDescriptor.h"
 
 #include <string>
 

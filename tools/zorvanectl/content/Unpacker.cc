@@ -2,7 +2,7 @@
 #include "Unpacker.h"
 
 #include "ItemRules.h"
-#include "platform/linux/Openat2.h"
+#include "os/Openat2.h"
 #include "zorvane/Text.h"
 
 #include <algorithm>

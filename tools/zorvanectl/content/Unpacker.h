@@ -12,8 +12,8 @@
 #include "ArchiveRecord.h"
 #include "Course.h"
 #include "Failure.h"
+#include "os/FileDescriptor.h"
 #include "platform/Disk.h"
-#include "platform/FileDescriptor.h"
 
 #include <cstdint>
 #include <span>

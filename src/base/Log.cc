@@ -1,0 +1,69 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "base/Log.h"
+
+#include "plist/EscapedText.h"
+
+namespace zor {
+
+namespace {
+
+thread_local std::optional<std::uint32_t> provokingUserId;
+
+/// Time, process and level, before the function's name.
+constexpr std::size_t lineHeadBytes = 64;
+
+/// The bytes of a line: an escape is up to four times as long as the character that it stands for.
+std::size_t bytesInLog(const char* function, std::string_view message) {
+    std::string shown = function;
+    plist::appendEscaped(shown, message);
+    return lineHeadBytes + shown.size();
+}
+
+} // namespace
+
+Log::ClientScope::ClientScope(std::uint32_t userId) : outer_(provokingUserId) {
+    provokingUserId = userId;
+}
+
+Log::ClientScope::~ClientScope() {
+    provokingUserId = outer_;
+}
+
+bool Log::writes(int level) const {
+    if (!sink_.isOpen())
+        return level <= logLevelNotice;
+    return sink_.level() >= level;
+}
+
+void Log::write(int level, const char* function, const char* format, ...) const noexcept {
+    std::va_list arguments;
+    va_start(arguments, format);
+    try {
+        writeText(level, function, formattedList(format, arguments));
+    } catch (...) {
+        linesLost_.fetch_add(1, std::memory_order_relaxed);
+    }
+    va_end(arguments);
+}
+
+void Log::writeText(int level, const char* function, std::string_view message) const noexcept {
+    if (!writes(level))
+        return;
+    try {
+        if (level <= logLevelError && provokingUserId && refusalGate_ &&
+            !refusalGate_(*provokingUserId, bytesInLog(function, message)))
+            return;
+        sink_.write(level, function, message);
+    } catch (...) {
+        linesLost_.fetch_add(1, std::memory_order_relaxed);
+    }
+}
+
+Shown::Shown(const std::string& text) : text_(text.c_str()) {
+    if (text.size() > shownBytesMax) {
+        copy_ = text.substr(0, shownBytesMax);
+        text_ = copy_.c_str();
+    }
+}
+
+} // namespace zor

@@ -1,0 +1,55 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "base/UserIdentity.h"
+
+#include <utility>
+
+namespace zor {
+
+bool userIdIsValidForClass(ContainerClass containerClass, std::uint32_t userId) {
+    if (isBundleClass(containerClass))
+        return userId == bundleOwnerUserId;
+    if (isSystemClass(containerClass))
+        return userId == systemOwnerUserId;
+    if (isPerUserClass(containerClass))
+        return userId >= firstMobileUserId && userId <= lastMobileUserId;
+    return false;
+}
+
+Result<std::uint32_t> UserIdentity::validateUserId(std::uint32_t requested, ContainerClass containerClass,
+                                                   std::uint32_t clientUserId) {
+    if (isBundleClass(containerClass) || isSystemClass(containerClass)) {
+        if (userIdIsValidForClass(containerClass, requested))
+            return requested;
+    } else if (clientUserId <= lastSystemClientUserId) {
+        if (requested == currentUserPlaceholder)
+            return getCurrentMobileUserId();
+        if (userIdIsValidForClass(containerClass, requested))
+            return requested;
+    } else if (requested == currentUserPlaceholder || requested == clientUserId) {
+        return clientUserId;
+    }
+    const std::string text = formatted("Invalid userId %u for class %llu from client %u", requested,
+                                       static_cast<unsigned long long>(containerClass), clientUserId);
+    log_.writeText(logLevelError, __func__, text);
+    return ZORError(ZOR_HERE, ErrorDomain::zor, static_cast<int>(ErrorCode::valueNotAllowed), text);
+}
+
+std::uint32_t UserIdentity::getCurrentMobileUserId() {
+    constexpr const char* function = "__getCurrentMobileUserId_block_invoke";
+    if (const std::int64_t known = mobileUserId_; known != notLookedUp)
+        return static_cast<std::uint32_t>(known);
+    const platform::MutexLock held(lookup_);
+    if (const std::int64_t known = mobileUserId_; known != notLookedUp)
+        return static_cast<std::uint32_t>(known);
+    const auto entry = passwords_.entryForName("mobile");
+    if (entry)
+        log_.write(logLevelError, function, "Current mobile user ID is %u", entry->uid);
+    else if (!std::exchange(saidMissing_, true))
+        log_.write(logLevelError, function, "Failed to get mobile uid. This is bad");
+    const std::uint32_t userId = entry ? entry->uid : 0;
+    if (entry)
+        mobileUserId_ = userId;
+    return userId;
+}
+
+} // namespace zor

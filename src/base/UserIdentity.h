@@ -1,0 +1,44 @@
+// SPDX-License-Identifier: Apache-2.0
+// Whose containers a request may act on: the owner that each class demands, and what a client's own uid allows.
+#pragma once
+
+#include "base/ContainerClass.h"
+#include "base/Mutex.h"
+#include "base/Result.h"
+#include "base/UserNumbers.h"
+#include "platform/Queries.h"
+
+#include <atomic>
+#include <cstdint>
+
+namespace zor {
+
+/// The user id in a request that stands for the current mobile user. Never stored as an owner.
+inline constexpr std::uint32_t currentUserPlaceholder = 1;
+inline constexpr std::uint32_t bundleOwnerUserId = 33;
+inline constexpr std::uint32_t systemOwnerUserId = 499;
+
+/// Whether `userId` may own containers of the class. Classes outside 1 to 13 have no owner.
+[[nodiscard]] bool userIdIsValidForClass(ContainerClass containerClass, std::uint32_t userId);
+
+class UserIdentity {
+public:
+    UserIdentity(const Log& log, const platform::PasswordDatabase& passwords) : log_(log), passwords_(passwords) {}
+
+    /// The user that a request acts on, or error 38 (logged). `requested` is the low 32 bits of what the client sent.
+    [[nodiscard]] Result<std::uint32_t> validateUserId(std::uint32_t requested, ContainerClass containerClass,
+                                                       std::uint32_t clientUserId);
+    /// The uid of the account "mobile", 0 when there is none. Looked up once, and again as long as it was not found: an
+    /// account can be added. Concurrent first callers wait for it.
+    [[nodiscard]] std::uint32_t getCurrentMobileUserId();
+
+private:
+    const Log& log_;
+    const platform::PasswordDatabase& passwords_;
+    platform::Mutex lookup_; // held while the database is asked
+    bool saidMissing_ ZOR_GUARDED_BY(lookup_) = false;
+    static constexpr std::int64_t notLookedUp = -1;
+    std::atomic<std::int64_t> mobileUserId_{notLookedUp};
+};
+
+} // namespace zor

@@ -1,0 +1,78 @@
+// SPDX-License-Identifier: Apache-2.0
+// Error values: a domain, a code, what happened in words, what caused it, and where it was made.
+#pragma once
+
+#include "base/ErrorCode.h"
+#include "base/Log.h"
+#include "base/Shortage.h"
+
+#include <memory>
+#include <optional>
+#include <string>
+
+namespace zor {
+
+enum class ErrorDomain : std::uint8_t { zor, posix };
+
+/// Where an error is made.
+struct Here {
+    const char* function;
+    int line;
+};
+#define ZOR_HERE (::zor::Here{__func__, __LINE__})
+
+using platform::isOwnShortage;
+
+class ZORError {
+public:
+    ZORError(Here here, ErrorDomain domain, int code, std::optional<std::string> description,
+             std::shared_ptr<const ZORError> underlying = nullptr)
+        : domain_(domain), code_(code), line_(here.line), function_(here.function),
+          description_(std::move(description)), underlying_(std::move(underlying)) {}
+
+    [[nodiscard]] ErrorDomain domain() const { return domain_; }
+    [[nodiscard]] const char* domainName() const { return domain_ == ErrorDomain::zor ? "ZORErrorDomain" : "POSIX"; }
+    [[nodiscard]] int code() const { return code_; }
+    [[nodiscard]] const std::optional<std::string>& description() const { return description_; }
+    [[nodiscard]] const ZORError* underlying() const { return underlying_.get(); }
+    [[nodiscard]] const char* functionName() const { return function_; }
+    [[nodiscard]] int sourceFileLine() const { return line_; }
+
+    [[nodiscard]] bool is(ErrorCode code) const {
+        return domain_ == ErrorDomain::zor && code_ == static_cast<int>(code);
+    }
+    [[nodiscard]] bool isPosix(int number) const { return domain_ == ErrorDomain::posix && code_ == number; }
+    /// Whether its POSIX number, or that of what caused it, is one of those.
+    [[nodiscard]] bool isOwnShortage() const;
+    /// What a client gets as "ReplyError": the code, sign-extended from 32 bits. There 1 is success, so EPERM leaves as
+    /// EACCES.
+    [[nodiscard]] ErrorCode replyCode() const;
+    /// For a line: domain, code and description, without the cause.
+    [[nodiscard]] std::string text() const;
+
+private:
+    ErrorDomain domain_;
+    int code_;
+    int line_;
+    const char* function_;
+    std::optional<std::string> description_;
+    std::shared_ptr<const ZORError> underlying_;
+};
+
+enum class LogFlag { no, yes };
+
+/// An error of ZORErrorDomain. With LogFlag::yes exactly one level-3 line is written, here and nowhere else.
+/// `underlying` is copied; nullptr when there is no cause.
+ZORError makeError(const Log& log, Here here, ErrorCode code, const ZORError* underlying, LogFlag flag,
+                   const char* format, ...) __attribute__((format(printf, 6, 7)));
+
+/// An error of the POSIX domain; never logs.
+ZORError posixError(Here here, int number, const char* format, ...) __attribute__((format(printf, 3, 4)));
+
+/// The level-3 line of an error that was made without one.
+void logError(const Log& log, const ZORError& error);
+
+/// The text of an errno value, safe in any thread.
+const char* errorText(int number);
+
+} // namespace zor

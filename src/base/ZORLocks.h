@@ -1,0 +1,125 @@
+// SPDX-License-Identifier: Apache-2.0
+// Locks by container identifier, and the one lock over all of them.
+//
+// Each identifier in use has a reader/writer lock, made by its first user and destroyed by its last. The
+// all-identifiers lock excludes, in write mode, every identifier lock; in read mode, every identifier writer.
+// Operations on one known container lock its UUID string; operations that may touch any identifier take the
+// all-identifiers lock.
+//
+// One mutex guards the bookkeeping and is never held while a caller waits for an identifier's own lock. A caller counts
+// before it waits there, so a pending identifier lock already keeps an all-identifiers writer out. Several identifiers
+// are locked in ascending order of their strings; that is the lock order of the daemon, so overlapping sets cannot
+// deadlock. Nothing here times out.
+//
+// Taking an identifier's lock may throw for want of memory, and changes nothing then: from the count of a caller on
+// nothing throws, and nothing does that gives a lock back. So a lock that is counted has an owner who gives it back.
+//
+// Misuse (unlocking what is not locked) is said at level 3 and changes nothing.
+#pragma once
+
+#include "base/Log.h"
+#include "base/Mutex.h"
+
+#include <atomic>
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <shared_mutex>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+namespace zor {
+
+enum class LockMode { reading, writing };
+
+class ZORLocks {
+public:
+    explicit ZORLocks(const Log& log) : log_(log) {}
+    ZORLocks(const ZORLocks&) = delete;
+    ZORLocks& operator=(const ZORLocks&) = delete;
+
+    void _lock_identifier(std::string_view identifier, LockMode mode) { take_one_lock(identifier, mode); }
+    void unlock_identifier(std::string_view identifier) noexcept { unlock_one_lock(identifier); }
+    /// Each distinct identifier once, in ascending order.
+    void _lock_identifier(std::vector<std::string> identifiers, LockMode mode);
+    /// The same set as was locked, in descending order.
+    void unlock_identifier(std::vector<std::string> identifiers);
+
+    void _lock_all_identifiers(LockMode mode) noexcept ZOR_EXCLUDES(mutex_);
+    void unlock_all_identifiers() noexcept ZOR_EXCLUDES(mutex_);
+
+    void take_one_lock(std::string_view identifier, LockMode mode) ZOR_EXCLUDES(mutex_);
+    void unlock_one_lock(std::string_view identifier) noexcept ZOR_EXCLUDES(mutex_);
+
+    /// How many identifiers are locked or awaited, for tests and the status.
+    [[nodiscard]] std::size_t identifiersInUse() const ZOR_EXCLUDES(mutex_);
+
+private:
+    struct Record {
+        std::shared_mutex lock;
+        std::uint64_t userCount = 1;            // guarded by mutex_
+        std::atomic<std::int32_t> lockState{0}; // 0 free, -1 write-held, n > 0 held by n readers
+    };
+
+    [[nodiscard]] bool noIdentifierIsLocked() const ZOR_REQUIRES(mutex_) {
+        return identifierReaderCount_ == 0 && identifierWriterCount_ == 0;
+    }
+    [[nodiscard]] bool everythingIsFree() const ZOR_REQUIRES(mutex_) {
+        return allReaderWriterState_ == 0 && noIdentifierIsLocked();
+    }
+    /// Counts a caller in, which from then on keeps the record and whoever wants all identifiers out. Throws
+    /// std::bad_alloc, and has counted nobody then.
+    Record& admit(std::string_view identifier, LockMode mode) ZOR_EXCLUDES(mutex_);
+    /// Waits for the own lock of an identifier whose caller is counted.
+    void acquire(Record& record, std::string_view identifier, LockMode mode) noexcept;
+    /// Lets others run, without the mutex.
+    void yield() ZOR_REQUIRES(mutex_);
+    void waitForAll(platform::ConditionVariable& condition) ZOR_REQUIRES(mutex_);
+
+    const Log& log_;
+    mutable platform::Mutex mutex_;
+    platform::ConditionVariable allWriter_;
+    platform::ConditionVariable allReader_;
+    platform::ConditionVariable identifierWriter_;
+    platform::ConditionVariable identifierReader_;
+    std::map<std::string, std::unique_ptr<Record>, std::less<>> identifierToLockMap_ ZOR_GUARDED_BY(mutex_);
+    std::uint32_t identifierReaderCount_ ZOR_GUARDED_BY(mutex_) = 0; // held or being acquired
+    std::uint32_t identifierWriterCount_ ZOR_GUARDED_BY(mutex_) = 0; // held or being acquired
+    std::int32_t allReaderWriterState_ ZOR_GUARDED_BY(mutex_) = 0;   // 0 free, -1 write-held, n > 0 n readers
+};
+
+/// Holds the lock of one identifier for as long as it lives.
+class IdentifierLock {
+public:
+    IdentifierLock(ZORLocks& locks, std::string identifier, LockMode mode)
+        : locks_(locks), identifier_(std::move(identifier)) {
+        locks_._lock_identifier(identifier_, mode);
+    }
+    IdentifierLock(const IdentifierLock&) = delete;
+    IdentifierLock& operator=(const IdentifierLock&) = delete;
+    ~IdentifierLock() { locks_.unlock_identifier(identifier_); }
+
+private:
+    ZORLocks& locks_;
+    const std::string identifier_;
+};
+
+/// Holds the all-identifiers lock from construction to destruction or `unlock`, whichever comes first.
+class AllIdentifiersLock {
+public:
+    AllIdentifiersLock(ZORLocks& locks, LockMode mode) : locks_(&locks) { locks._lock_all_identifiers(mode); }
+    AllIdentifiersLock(const AllIdentifiersLock&) = delete;
+    AllIdentifiersLock& operator=(const AllIdentifiersLock&) = delete;
+    ~AllIdentifiersLock() { unlock(); }
+    void unlock() {
+        if (locks_)
+            std::exchange(locks_, nullptr)->unlock_all_identifiers();
+    }
+
+private:
+    ZORLocks* locks_;
+};
+
+} // namespace zor

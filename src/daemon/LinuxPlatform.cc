@@ -1,0 +1,100 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "daemon/LinuxPlatform.h"
+
+#include "os/Names.h"
+
+#include <cerrno>
+#include <cstring>
+#include <unistd.h>
+
+namespace zor::platform {
+
+namespace {
+
+constexpr int levelError = 3;
+constexpr const char* deathRowLabel = "com.veltra.zorvaned.deathrow";
+constexpr const char* lockStateLabel = "com.veltra.zorvaned.lockstate";
+
+std::unexpected<std::string> cannot(const std::string& what, int error) {
+    return std::unexpected(what + ": " + ::strerrordesc_np(error));
+}
+
+} // namespace
+
+std::expected<std::unique_ptr<LinuxPlatform>, std::string> LinuxPlatform::open(Options options) {
+    if (!LinuxPeerIdentity::procIsOurs())
+        return std::unexpected(
+            std::string("/proc is not mounted or belongs to another pid namespace: clients would be "
+                        "taken for other processes. Mount a /proc of this namespace and start again"));
+    auto root = SystemRoot::open(options.rootDirectory);
+    if (!root)
+        return cannot("cannot open the root " + options.rootDirectory, root.error());
+    if (root->isDeviceRoot())
+        options.syncs = Syncs::on;
+    LinuxDisk disk(options.syncs);
+    const std::string runtime = root->path(names::runtimeDirectory);
+    if (const int error = root->makeRuntimeDirectory(disk); error != 0)
+        return cannot("cannot make " + runtime, error);
+    auto lock = DaemonLock::take(*root);
+    if (!lock && lock.error() == EWOULDBLOCK)
+        return std::unexpected("another daemon serves the root " + root->canonicalPath());
+    if (!lock)
+        return cannot("cannot lock " + runtime + "/" + names::lockFile, lock.error());
+    return std::unique_ptr<LinuxPlatform>(new LinuxPlatform(std::move(*root), std::move(*lock), std::move(options)));
+}
+
+LinuxPlatform::LinuxPlatform(SystemRoot root, DaemonLock lock, Options options)
+    : root_(std::move(root)), lock_(std::move(lock)), passed_(std::move(options.passed)), disk_(options.syncs),
+      log_(options.foreground), registry_(root_, log_, ::geteuid()), peers_(registry_, ::geteuid()),
+      upcallPort_(root_, peers_, passed_.take(names::passedUpcallSocket)),
+      listener_(peers_, listenerOptions(options.listenerLimits)),
+      deathRowQueue_(deathRowLabel, WorkQueue::Priority::background), lockStateQueue_(lockStateLabel) {
+    // Where the loop cannot follow it, the registry looks for itself.
+    (void)registry_.follow(runLoop_);
+}
+
+LinuxPlatform::~LinuxPlatform() {
+    finish();
+    registry_.unfollow(runLoop_);
+}
+
+void LinuxPlatform::finish() {
+    listener_.stop();
+    lockStateQueue_.finish();
+    deathRowQueue_.finish();
+}
+
+ListenerOptions LinuxPlatform::listenerOptions(const ListenerLimits& limits) {
+    ListenerOptions options;
+    options.address = {.directory = root_.runtimeDirectory(),
+                       .directoryPath = root_.path(names::runtimeDirectory),
+                       .name = names::serviceSocket};
+    options.passed = passed_.take(names::passedServiceSocket);
+    options.limits = limits;
+    options.report = [this](std::string_view line) { log_.write(levelError, "ServiceListener", line); };
+    return options;
+}
+
+Platform LinuxPlatform::roles() {
+    return {.root = root_,
+            .disk = disk_,
+            .log = log_,
+            .internalBuild = internalBuild_,
+            .systemVersion = systemVersion_,
+            .passwords = passwords_,
+            .lockState = lockState_,
+            .protection = protection_,
+            .sandbox = sandbox_,
+            .assertions = assertions_,
+            .crash = crash_,
+            .bootMarker = bootMarker_,
+            .transactions = transactions_,
+            .deathRowQueue = deathRowQueue_,
+            .lockStateQueue = lockStateQueue_,
+            .runLoop = runLoop_,
+            .peers = peers_,
+            .listener = listener_,
+            .upcallPort = upcallPort_};
+}
+
+} // namespace zor::platform

@@ -1,0 +1,95 @@
+// SPDX-License-Identifier: Apache-2.0
+// One of each role of the platform, on Linux: what a daemon runs on. Made by main, or by a test over a root of its own;
+// several can live in one process, over different roots.
+//
+// The order of the members is the order in which they come into being; they go the other way round.
+#pragma once
+
+#include "device/DeviceQueries.h"
+#include "device/FileCrashAnnotation.h"
+#include "device/FileDeviceLockState.h"
+#include "device/FileTerminationAssertionService.h"
+#include "device/LinkSandboxUserState.h"
+#include "device/SemaphoreBootMarker.h"
+#include "device/XattrProtectionClass.h"
+#include "identity/IdentityRegistry.h"
+#include "identity/LinuxPasswordDatabase.h"
+#include "identity/LinuxPeerIdentity.h"
+#include "os/DaemonLock.h"
+#include "os/EpollRunLoop.h"
+#include "os/LinuxDisk.h"
+#include "os/RotatingLog.h"
+#include "os/SerialWorkQueue.h"
+#include "os/SystemRoot.h"
+#include "platform/Platform.h"
+#include "service/LinuxServiceListener.h"
+#include "service/PassedSockets.h"
+#include "service/SeqpacketUpcallPort.h"
+
+#include <expected>
+#include <memory>
+#include <string>
+
+namespace zor::platform {
+
+class LinuxPlatform {
+public:
+    struct Options {
+        std::string rootDirectory = "/";
+        RotatingLog::Foreground foreground = RotatingLog::Foreground::no;
+        /// On "/" they are on, whatever is asked for.
+        Syncs syncs = Syncs::on;
+        PassedSockets passed;
+        ListenerLimits listenerLimits;
+    };
+
+    /// Opens the root, makes the runtime directory and takes the daemon's lock; nothing is served yet. Else one line
+    /// that says what stood in the way.
+    [[nodiscard]] static std::expected<std::unique_ptr<LinuxPlatform>, std::string> open(Options options);
+    ~LinuxPlatform();
+    LinuxPlatform(const LinuxPlatform&) = delete;
+    LinuxPlatform& operator=(const LinuxPlatform&) = delete;
+
+    [[nodiscard]] Platform roles();
+
+    [[nodiscard]] const SystemRoot& root() const { return root_; }
+    [[nodiscard]] EpollRunLoop& runLoop() { return runLoop_; }
+    [[nodiscard]] LinuxServiceListener& listener() { return listener_; }
+    [[nodiscard]] LinuxPeerIdentity& peers() { return peers_; }
+    [[nodiscard]] SemaphoreBootMarker& bootMarker() { return bootMarker_; }
+    [[nodiscard]] RotatingLog& log() { return log_; }
+    [[nodiscard]] PassedSockets& passedSockets() { return passed_; }
+
+    /// Stops the listener and finishes the queues: from then on nothing calls into what was built on the roles. To be
+    /// called before that goes.
+    void finish();
+
+private:
+    LinuxPlatform(SystemRoot root, DaemonLock lock, Options options);
+    [[nodiscard]] ListenerOptions listenerOptions(const ListenerLimits& limits);
+
+    SystemRoot root_;
+    DaemonLock lock_;
+    PassedSockets passed_;
+    LinuxDisk disk_;
+    RotatingLog log_;
+    EpollRunLoop runLoop_;
+    LinuxInternalBuildQuery internalBuild_{root_};
+    LinuxSystemVersionQuery systemVersion_{root_};
+    LinuxPasswordDatabase passwords_{root_};
+    FileDeviceLockState lockState_{root_};
+    XattrProtectionClass protection_{disk_, lockState_};
+    LinkSandboxUserState sandbox_{root_, disk_};
+    FileTerminationAssertionService assertions_{root_, disk_};
+    FileCrashAnnotation crash_{root_, disk_};
+    SemaphoreBootMarker bootMarker_{root_};
+    ServiceTransactions transactions_;
+    IdentityRegistry registry_;
+    LinuxPeerIdentity peers_;
+    SeqpacketUpcallPort upcallPort_;
+    LinuxServiceListener listener_;
+    SerialWorkQueue deathRowQueue_;
+    SerialWorkQueue lockStateQueue_;
+};
+
+} // namespace zor::platform

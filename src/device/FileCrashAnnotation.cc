@@ -1,0 +1,44 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "device/FileCrashAnnotation.h"
+
+#include "os/Names.h"
+#include "os/Openat2.h"
+
+#include <cerrno>
+#include <fcntl.h>
+#include <string>
+#include <syslog.h>
+
+namespace zor::platform {
+
+namespace {
+constexpr mode_t fileMode = 0640;
+constexpr std::size_t messageBytesMax = 1024 * 1024;
+} // namespace
+
+void FileCrashAnnotation::record(std::string_view message) {
+    message = message.substr(0, messageBytesMax);
+    if (replaceFile(message) != 0)
+        ::syslog(LOG_DAEMON | LOG_CRIT, "%.*s", static_cast<int>(message.size()), message.data());
+}
+
+int FileCrashAnnotation::replaceFile(std::string_view message) {
+    const auto directory = openBeneath(root_.descriptor(), names::logDirectory, O_RDONLY | O_DIRECTORY);
+    if (!directory)
+        return directory.error();
+    const std::string temporary = std::string(".") + names::crashFile;
+    (void)disk_.unlinkFile(directory->get(), temporary.c_str());
+    const FileDescriptor file(disk_.createFile(directory->get(), temporary.c_str(), fileMode));
+    if (!file.valid())
+        return EIO;
+    int result = disk_.write(file.get(), {reinterpret_cast<const std::uint8_t*>(message.data()), message.size()});
+    if (result == 0)
+        result = disk_.sync(file.get());
+    if (result == 0)
+        result = disk_.rename(directory->get(), temporary.c_str(), directory->get(), names::crashFile, 0);
+    if (result == 0)
+        result = disk_.sync(directory->get());
+    return -result;
+}
+
+} // namespace zor::platform

@@ -1,0 +1,25 @@
+// SPDX-License-Identifier: Apache-2.0
+// The last message before an abort, in a file beside the log. The file is replaced whole: after a failure in the middle
+// the one before it is still there.
+#pragma once
+
+#include "os/SystemRoot.h"
+#include "platform/CrashAnnotation.h"
+#include "platform/Disk.h"
+
+namespace zor::platform {
+
+class FileCrashAnnotation final : public CrashAnnotation {
+public:
+    FileCrashAnnotation(const SystemRoot& root, Disk& disk) : root_(root), disk_(disk) {}
+    /// Where the file cannot be written the message goes to the system's own log instead.
+    void record(std::string_view message) override;
+
+private:
+    [[nodiscard]] int replaceFile(std::string_view message);
+
+    const SystemRoot& root_;
+    Disk& disk_;
+};
+
+} // namespace zor::platform

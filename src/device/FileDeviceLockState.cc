@@ -1,0 +1,132 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "device/FileDeviceLockState.h"
+
+#include "base/Shortage.h"
+#include "os/Inotify.h"
+#include "os/Names.h"
+#include "os/Openat2.h"
+#include "os/SmallFile.h"
+
+#include <cerrno>
+#include <charconv>
+#include <chrono>
+#include <fcntl.h>
+#include <sys/inotify.h>
+#include <unistd.h>
+#include <utility>
+
+namespace zor::platform {
+
+namespace {
+
+constexpr std::size_t stateBytesMax = 32;
+/// A shortage that is over by then is hardly noticed, and one that lasts costs next to nothing.
+constexpr std::chrono::milliseconds again{100};
+/// Somebody waits for an unlock to be seen, and until a lock is seen retries go on; an idle device hardly notices this.
+constexpr std::chrono::milliseconds lookEvery{250};
+/// A file that was changed twice within one tick of the kernel's clock looks the same after both; one that was left
+/// alone for as long as this will not.
+constexpr time_t settledSeconds = 1;
+constexpr std::uint32_t watchedEvents = IN_MOVED_TO | IN_MOVED_FROM | IN_CREATE | IN_DELETE | IN_CLOSE_WRITE;
+
+int parseState(std::string_view text) {
+    if (text.ends_with('\n'))
+        text.remove_suffix(1);
+    int state = FileDeviceLockState::unknown;
+    const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), state);
+    return error == std::errc() && end == text.data() + text.size() ? state : FileDeviceLockState::unknown;
+}
+
+} // namespace
+
+bool FileDeviceLockState::Known::isOf(const struct stat& status) const {
+    return device == status.st_dev && inode == status.st_ino && bytes == status.st_size &&
+           changed.tv_sec == status.st_ctim.tv_sec && changed.tv_nsec == status.st_ctim.tv_nsec;
+}
+
+int FileDeviceLockState::currentState() const {
+    struct stat status{};
+    if (::fstatat(root_.runtimeDirectory(), names::lockState, &status, AT_SYMLINK_NOFOLLOW) != 0)
+        return stateUnread(errno);
+    {
+        const MutexLock held(mutex_);
+        if (known_ && known_->isOf(status))
+            return known_->state;
+    }
+    return readState();
+}
+
+int FileDeviceLockState::readState() const {
+    const auto file = openBeneath(root_.runtimeDirectory(), names::lockState, O_RDONLY | O_NONBLOCK);
+    if (!file)
+        return stateUnread(file.error());
+    struct stat status{};
+    timespec now{};
+    const bool examined = ::fstat(file->get(), &status) == 0 && ::clock_gettime(CLOCK_REALTIME, &now) == 0;
+    const auto text = readSmallFile(file->get(), stateBytesMax);
+    if (!text)
+        return stateUnread(text.error());
+    const int state = parseState(*text);
+    const MutexLock held(mutex_);
+    known_.reset();
+    if (examined && status.st_ctim.tv_sec + settledSeconds < now.tv_sec)
+        known_ = {.device = status.st_dev,
+                  .inode = status.st_ino,
+                  .bytes = status.st_size,
+                  .changed = status.st_ctim,
+                  .state = state};
+    return state;
+}
+
+int FileDeviceLockState::stateUnread(int error) const {
+    if (error == ENOENT)
+        return unlocked;
+    if (isOwnShortage(error) && again_)
+        again_->set(again);
+    return unknown;
+}
+
+const char* FileDeviceLockState::notificationName() const {
+    return names::lockState;
+}
+
+int FileDeviceLockState::registerForChanges(RunLoop& loop, std::function<void()> changed) {
+    loop_ = &loop;
+    changed_ = std::move(changed);
+    again_.emplace(loop, [this] { lookAgain(); });
+    const int error = follow();
+    if (error != 0)
+        again_->set(lookEvery);
+    return error;
+}
+
+int FileDeviceLockState::follow() {
+    FileDescriptor inotify(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
+    if (!inotify.valid())
+        return errno;
+    if (const auto watch = watchDirectory(inotify.get(), root_.runtimeDirectory(), watchedEvents); !watch)
+        return watch.error();
+    const bool watched = loop_->watch(inotify.get(), [this] {
+        if (takeEvents())
+            changed_();
+    });
+    if (!watched)
+        return ENOMEM;
+    inotify_ = std::move(inotify);
+    return 0;
+}
+
+void FileDeviceLockState::lookAgain() {
+    // Before the look: what changes after it is then noticed.
+    if (!inotify_.valid() && follow() != 0)
+        again_->set(lookEvery);
+    changed_();
+}
+
+bool FileDeviceLockState::takeEvents() const {
+    return readInotify(inotify_.get(), [](const inotify_event& event, std::string_view name) {
+        return (event.mask & IN_Q_OVERFLOW) != 0 || name == names::lockState;
+    });
+}
+
+} // namespace zor::platform

@@ -1,0 +1,63 @@
+// SPDX-License-Identifier: Apache-2.0
+// The lock state as the number in run/zorvane/lockstate, which whoever manages the lock replaces by rename.
+//
+// No file is 0, unlocked. A file that holds no number is -1: neither locked nor unlocked, so nothing that waits for an
+// unlock starts, and nothing begins to wait for one that may never be said. It is -1 too when there is no descriptor or
+// no memory to look with; then the loop is told a moment later, as of a change, for nobody will change it again because
+// a notice was not understood. Where the system gives no notices (each user has so many of them) the loop is told four
+// times a second, and the notices are tried again each time. What was read is kept for as long as the file is the same
+// and unchanged, which is looked up each time: a change of protection class asks for every file. Any thread.
+#pragma once
+
+#include "base/Mutex.h"
+#include "os/FileDescriptor.h"
+#include "os/SystemRoot.h"
+#include "platform/DeviceLockState.h"
+
+#include <optional>
+#include <sys/stat.h>
+
+namespace zor::platform {
+
+class FileDeviceLockState final : public DeviceLockState {
+public:
+    static constexpr int unknown = -1;
+
+    explicit FileDeviceLockState(const SystemRoot& root) : root_(root) {}
+    [[nodiscard]] int currentState() const override;
+    /// Once. The loop outlives this object, and has ended when it goes.
+    int registerForChanges(RunLoop& loop, std::function<void()> changed) override;
+    [[nodiscard]] const char* registrationCallName() const override { return "inotify_add_watch"; }
+    [[nodiscard]] const char* notificationName() const override;
+
+private:
+    /// The state that a file holds, and by what it is known again.
+    struct Known {
+        dev_t device;
+        ino_t inode;
+        off_t bytes;
+        timespec changed;
+        int state;
+
+        [[nodiscard]] bool isOf(const struct stat& status) const;
+    };
+    [[nodiscard]] int readState() const;
+    /// What a look that failed says.
+    [[nodiscard]] int stateUnread(int error) const;
+    [[nodiscard]] bool takeEvents() const;
+    /// 0, or the errno for which there are no notices.
+    [[nodiscard]] int follow();
+    void lookAgain();
+
+    const SystemRoot& root_;
+    RunLoop* loop_ = nullptr;
+    std::function<void()> changed_;
+    /// Invalid: there are no notices.
+    FileDescriptor inotify_;
+    /// Runs out a moment after a look that a shortage prevented, and again and again where there are no notices.
+    std::optional<LoopTimer> again_;
+    mutable Mutex mutex_;
+    mutable std::optional<Known> known_ ZOR_GUARDED_BY(mutex_);
+};
+
+} // namespace zor::platform

@@ -1,0 +1,150 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "identity/IdentityFile.h"
+
+#include "base/EntitlementKeys.h"
+#include "ipc/Identifier.h"
+#include "plist/Read.h"
+
+#include <algorithm>
+#include <array>
+#include <limits>
+
+namespace zor::platform {
+
+namespace {
+
+constexpr std::string_view keyIdentifier = "Identifier";
+constexpr std::string_view keyExecutable = "Executable";
+constexpr std::string_view keyUserIds = "UserIDs";
+constexpr std::string_view keyUnit = "Unit";
+constexpr std::string_view keySecurityLabel = "SecurityLabel";
+constexpr std::string_view keyEntitlements = "Entitlements";
+constexpr std::string_view keyKernelAgent = "KernelAgent";
+constexpr std::string_view keyOnlyOwnIdentifier = "OnlyOwnIdentifier";
+constexpr std::array keysKnown = {keyIdentifier,    keyExecutable,   keyUserIds,     keyUnit,
+                                  keySecurityLabel, keyEntitlements, keyKernelAgent, keyOnlyOwnIdentifier};
+
+using Problem = std::optional<std::string>;
+
+std::string wrong(std::string_view key, std::string_view what) {
+    return "\"" + std::string(key) + "\" is " + std::string(what);
+}
+
+Problem readString(const plist::Dictionary& file, std::string_view key, std::optional<std::string>& out) {
+    const plist::Value* const value = file.find(key);
+    if (!value)
+        return {};
+    const std::string* const text = value->asString();
+    if (!text || text->empty() || text->find('\0') != std::string::npos)
+        return wrong(key, "no string, or an empty one");
+    out = *text;
+    return {};
+}
+
+Problem readFlag(const plist::Dictionary& file, std::string_view key, bool& out) {
+    const plist::Value* const value = file.find(key);
+    if (!value)
+        return {};
+    const bool* const flag = value->asBoolean();
+    if (!flag)
+        return wrong(key, "no boolean");
+    out = *flag;
+    return {};
+}
+
+Problem readUserIds(const plist::Dictionary& file, RegistryEntry& entry) {
+    const plist::Value* const value = file.find(keyUserIds);
+    if (!value)
+        return {};
+    const plist::Array* const array = value->asArray();
+    if (!array)
+        return wrong(keyUserIds, "no array");
+    entry.userIds.emplace();
+    for (const plist::Value& element : *array) {
+        const auto uid = element.asUnsigned();
+        // The largest number is what the kernel calls no user at all.
+        if (!uid || *uid >= std::numeric_limits<std::uint32_t>::max())
+            return wrong(keyUserIds, "not an array of user ids");
+        entry.userIds->push_back(static_cast<std::uint32_t>(*uid));
+    }
+    return {};
+}
+
+Problem readGrant(const plist::Dictionary& file, RegistryEntry& entry) {
+    auto grant = std::make_shared<IdentityGrant>();
+    if (Problem problem = readString(file, keyIdentifier, grant->identifier))
+        return problem;
+    if (grant->identifier && !ipc::isIdentifier(*grant->identifier))
+        return wrong(keyIdentifier, "longer than " + std::to_string(ipc::identifierBytesMax) + " bytes");
+    if (const plist::Value* const value = file.find(keyEntitlements)) {
+        const plist::Dictionary* const entitlements = value->asDictionary();
+        if (!entitlements)
+            return wrong(keyEntitlements, "no dictionary");
+        grant->entitlements = *entitlements;
+    }
+    if (Problem problem = readFlag(file, keyKernelAgent, grant->kernelAgent))
+        return problem;
+    if (Problem problem = readFlag(file, keyOnlyOwnIdentifier, grant->onlyOwnIdentifier))
+        return problem;
+    entry.grant = std::move(grant);
+    return {};
+}
+
+Problem readEntry(const plist::Dictionary& file, RegistryEntry& entry) {
+    for (const auto& [key, value] : file) {
+        if (std::ranges::find(keysKnown, key) == keysKnown.end())
+            return wrong(key, "not a key of this file");
+    }
+    std::optional<std::string> executable;
+    if (Problem problem = readString(file, keyExecutable, executable))
+        return problem;
+    if (!executable || executable->front() != '/')
+        return wrong(keyExecutable, "missing or no absolute path");
+    entry.executable = std::move(*executable);
+    if (Problem problem = readString(file, keyUnit, entry.unit))
+        return problem;
+    if (Problem problem = readString(file, keySecurityLabel, entry.securityLabel))
+        return problem;
+    if (Problem problem = readUserIds(file, entry))
+        return problem;
+    return readGrant(file, entry);
+}
+
+/// What lets its holder act on containers of others.
+bool isPowerful(const IdentityGrant& grant) {
+    if (grant.kernelAgent)
+        return true;
+    return grant.entitlements && (grant.entitlements->isTrue(entitlementKeys::allowed) ||
+                                  grant.entitlements->isTrue(entitlementKeys::otherIdLookup) ||
+                                  grant.entitlements->array(entitlementKeys::wipeContainer));
+}
+
+} // namespace
+
+bool RegistryEntry::admitsUser(std::uint32_t reportedUserId) const {
+    if (userIds)
+        return std::ranges::find(*userIds, reportedUserId) != userIds->end();
+    return reportedUserId == 0 || !isPowerful(*grant);
+}
+
+bool RegistryEntry::operator==(const RegistryEntry& other) const {
+    return executable == other.executable && userIds == other.userIds && unit == other.unit &&
+           securityLabel == other.securityLabel && grant->identifier == other.grant->identifier &&
+           grant->entitlements == other.grant->entitlements && grant->kernelAgent == other.grant->kernelAgent &&
+           grant->onlyOwnIdentifier == other.grant->onlyOwnIdentifier;
+}
+
+std::expected<RegistryEntry, std::string> parseIdentityFile(std::span<const std::uint8_t> bytes) {
+    const auto list = plist::readPropertyList(bytes);
+    if (!list)
+        return std::unexpected(list.error().text());
+    const plist::Dictionary* const file = list->asDictionary();
+    if (!file)
+        return std::unexpected("the property list is no dictionary");
+    RegistryEntry entry;
+    if (Problem problem = readEntry(*file, entry))
+        return std::unexpected(std::move(*problem));
+    return entry;
+}
+
+} // namespace zor::platform

@@ -1,0 +1,77 @@
+// SPDX-License-Identifier: Apache-2.0
+// Lists and reads the files of the identity registry, and judges whether they may be believed.
+//
+// A file counts only when it and its directory belong to root or the daemon's user and nobody else can write to them.
+// No link is followed, and a FIFO cannot hold up the reader. Keeps nothing; any thread.
+#pragma once
+
+#include "identity/IdentityFile.h"
+#include "os/FileDescriptor.h"
+#include "os/SystemRoot.h"
+
+#include <cstdint>
+#include <expected>
+#include <map>
+#include <optional>
+#include <string>
+#include <sys/stat.h>
+
+namespace zor::platform {
+
+/// What makes a file the same one, whatever its name in whichever mount namespace.
+struct FileId {
+    dev_t device = 0;
+    ino_t inode = 0;
+    bool operator==(const FileId&) const = default;
+};
+
+/// Everything about a file that changes when it does.
+struct FileStamp {
+    FileId id;
+    mode_t mode = 0;
+    uid_t uid = 0;
+    off_t bytes = 0;
+    std::int64_t modifiedNanoseconds = 0;
+    std::int64_t changedNanoseconds = 0;
+    bool operator==(const FileStamp&) const = default;
+};
+
+/// Why something does not count.
+struct RegistryProblem {
+    std::string text;
+    /// It says nothing of the file or directory: there was no descriptor or no memory to look at it with.
+    bool isShortage = false;
+    bool operator==(const RegistryProblem&) const = default;
+};
+
+/// The registry's files by name, in the order in which they count; none of them has been read.
+struct RegistryListing {
+    FileDescriptor directory;
+    std::map<std::string, FileStamp> files;
+    /// When something is wrong with the directory as a whole.
+    std::optional<RegistryProblem> problem;
+
+    [[nodiscard]] bool sameAs(const RegistryListing& other) const {
+        return files == other.files && problem == other.problem;
+    }
+};
+
+class RegistryDirectory {
+public:
+    static constexpr std::size_t fileBytesMax = std::size_t{1} << 20;
+    static constexpr std::size_t filesMax = 1024;
+
+    RegistryDirectory(const SystemRoot& root, uid_t daemonUserId) : root_(root), daemonUserId_(daemonUserId) {}
+
+    [[nodiscard]] RegistryListing list() const;
+    [[nodiscard]] std::expected<RegistryEntry, RegistryProblem> read(const RegistryListing& listing,
+                                                                     const std::string& name) const;
+
+private:
+    [[nodiscard]] std::optional<RegistryProblem> ownershipProblem(const struct stat& status) const;
+
+    const SystemRoot& root_;
+    const uid_t daemonUserId_;
+};
+
+} // namespace zor::platform

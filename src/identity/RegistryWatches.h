@@ -1,0 +1,57 @@
+// SPDX-License-Identifier: Apache-2.0
+// The change notices that the identity registry lives by: of its directory and those above it, and of the directories
+// that the registered executables lie in. One thread at a time.
+#pragma once
+
+#include "os/FileDescriptor.h"
+#include "os/SystemRoot.h"
+
+#include <cstdint>
+#include <map>
+#include <set>
+#include <string>
+#include <string_view>
+#include <sys/inotify.h>
+
+namespace zor::platform {
+
+class RegistryWatches {
+public:
+    explicit RegistryWatches(const SystemRoot& root);
+
+    /// Readable when there are notices; -1 when the system gave none.
+    [[nodiscard]] int descriptor() const { return inotify_.get(); }
+    /// False when a change may come without a notice.
+    [[nodiscard]] bool isComplete() const { return complete_; }
+
+    enum class Noticed { nothing, executables, registry };
+    /// Takes what is pending, without waiting.
+    [[nodiscard]] Noticed take();
+
+    // A new set of watches: begin, then whatever is to be watched, then end, which drops what is watched no more.
+    // Watches that are in both sets never pause.
+    void begin();
+    void watchRegistry();
+    void watchExecutable(const std::string& path);
+    void end();
+
+private:
+    /// What matters in one directory: these names, or everything.
+    struct Interest {
+        Noticed kind = Noticed::nothing;
+        bool everything = false;
+        std::set<std::string, std::less<>> names;
+    };
+
+    [[nodiscard]] Interest* watch(int directory, std::uint32_t events, Noticed kind);
+    void watchNameAt(const std::string& path);
+    [[nodiscard]] Noticed judge(const inotify_event& event, std::string_view name) const;
+
+    const SystemRoot& root_;
+    const FileDescriptor inotify_;
+    bool complete_ = true;
+    std::map<int, Interest> interests_;
+    std::map<int, Interest> interestsNew_;
+};
+
+} // namespace zor::platform

@@ -1,0 +1,176 @@
+// SPDX-License-Identifier: Apache-2.0
+// Death row: where everything goes that is to be deleted.
+//
+// A move here is one rename on the caller's thread, usually under the locks of its operation; the item gets a name of
+// its own, so names never collide. What lies on another file system than root's death row goes to a death row there
+// (fs/FileSystemDeathRow.h): nothing is ever copied to get out of the way. Passes (DeletionPass.cc) delete it later;
+// what is on death row belongs to no container. A stop at any point leaves items, or empty directories of theirs, for
+// the next pass; the launch queues one.
+//
+// Whoever owns the directory that holds a container can put a directory of another user's in its place. So it is asked
+// before the move whose the directory is, and again when it has come to death row, where nobody can change it any more:
+// another's goes back. A pass waits for that: it takes no item while one is being moved.
+#include "fs/AtomicFile.h"
+#include "fs/FileSystemDeathRow.h"
+#include "operations/StoreServices.h"
+#include "operations/ZORClientConnection.h"
+#include "os/Openat2.h"
+
+#include <cerrno>
+#include <cstdio>
+#include <fcntl.h>
+#include <unistd.h>
+
+namespace zor {
+
+namespace {
+
+constexpr const char* moveFunction = "_moveItemAtURLToDeathRow";
+/// Somebody may remove the fresh directory before the item is in it. That often in a row it is no accident.
+constexpr int directoriesTriedMax = 16;
+
+bool isMissing(int directory, const FileURL& url) {
+    const auto item =
+        platform::openBeneathOnMount(directory, std::string(url.lastPathComponent()).c_str(), O_PATH | O_NOFOLLOW);
+    return !item && item.error() == ENOENT;
+}
+
+/// A directory of another user's. Anything else in a container's place its owner may remove anyway. Without root's
+/// power all is the daemon's.
+bool isAnothers(const struct stat& status, std::uint32_t owner) {
+    return ::geteuid() == 0 && S_ISDIR(status.st_mode) && status.st_uid != owner;
+}
+
+} // namespace
+
+Result<void> ZORClientConnection::_moveItemAtURLToDeathRow(const FileURL& url, StartDeletionThread startDeletionThread,
+                                                           std::optional<std::uint32_t> owner) {
+    ZORFileManager& fileManager = services_.fileManager;
+    const FileURL deathRow = services_.configuration.deathrowDirectory();
+    for (int tried = 0;; ++tried) {
+        std::optional<FileURL> unique;
+        // A pass that met the fresh directory before what comes into it has been judged would remove that with it.
+        const auto moved = [&]() -> Result<DeathRow> {
+            const platform::MutexLock moving(services_.deathRow.moving);
+            auto made = fileManager.createTemporaryDirectoryInDirectoryURL(deathRow);
+            if (!made)
+                return std::move(made).error();
+            const FileURL destination = made->appendingDirectory(url.lastPathComponent());
+            unique.emplace(std::move(*made));
+            return condemn(url, destination, owner, moving);
+        }();
+        if (!unique)
+            return makeError(services_.log, {moveFunction, __LINE__}, ErrorCode::moveToDeathRowFailed, &moved.error(),
+                             LogFlag::yes, "Failed to create unique directory at: %s", url.c_str());
+        if (moved && *moved == DeathRow::ofFileSystem)
+            (void)fileManager.removeItemAtURL(unique);
+        if (moved) {
+            if (startDeletionThread == StartDeletionThread::yes)
+                deleteContainersOnDeathRowWithCompletion(nullptr);
+            return {};
+        }
+        // Only a missing source counts as success. When it is the unique directory that is missing, another one is
+        // made.
+        const bool somethingMissing = moved.error().isPosix(ENOENT);
+        if (somethingMissing && fileManager.itemDoesNotExistAtURL(url))
+            return {};
+        if (somethingMissing && fileManager.itemDoesNotExistAtURL(*unique) && tried < directoriesTriedMax)
+            continue;
+        return makeError(services_.log, {moveFunction, __LINE__}, ErrorCode::moveToDeathRowFailed, &moved.error(),
+                         LogFlag::yes, "Failed to move item at: %s to: %s", url.c_str(),
+                         unique->appendingDirectory(url.lastPathComponent()).c_str());
+    }
+}
+
+Result<ZORClientConnection::DeathRow> ZORClientConnection::condemn(const FileURL& url, const FileURL& destination,
+                                                                   std::optional<std::uint32_t> owner,
+                                                                   const platform::MutexLock& /*moving*/) {
+    const auto from = services_.fileManager.resolver().openParent(url);
+    const auto to = services_.fileManager.resolver().openParent(destination);
+    if (!from || !to) {
+        const int number = from ? to.error() : from.error();
+        return posixError({moveFunction, __LINE__}, number, "open of %s failed: %s",
+                          (from ? destination : url).deletingLastPathComponent().c_str(), errorText(number));
+    }
+    if (owner)
+        TRY(judgeOwner(from->directory.get(), url, *owner));
+    const auto renamed = services_.fileManager.renameItem(from->directory.get(), url, to->directory.get(), destination);
+    if (!renamed && renamed.error().isPosix(EXDEV)) {
+        TRY(condemnOnItsFileSystem(from->directory.get(), url, owner));
+        return DeathRow::ofFileSystem;
+    }
+    TRY(renamed);
+    if (owner)
+        TRY(putBackIfAnothers(from->directory.get(), url, to->directory.get(), destination, *owner));
+    return DeathRow::ofRoot;
+}
+
+Result<void> ZORClientConnection::condemnOnItsFileSystem(int from, const FileURL& url,
+                                                         std::optional<std::uint32_t> owner) {
+    ZORFileManager& fileManager = services_.fileManager;
+    const auto failed = [&](const FileURL& row, int number) {
+        return posixError({moveFunction, __LINE__}, number, "death row %s cannot be used: %s", row.c_str(),
+                          errorText(number));
+    };
+    const auto top = fs::topOfMount(fileManager.resolver(), url.deletingLastPathComponent());
+    if (!top)
+        return failed(url.deletingLastPathComponent(), top.error());
+    const FileURL row = fs::deathRowBelow(top->url);
+    for (int tried = 0;; ++tried) {
+        const auto opened = fs::openOrMakeDeathRow(fileManager.disk(), top->directory.get());
+        // Its owner may have renamed the directory that holds the row.
+        const bool again = tried < directoriesTriedMax && !isMissing(from, url);
+        if (!opened && opened.error() == ENOENT && again)
+            continue;
+        if (!opened)
+            return failed(row, opened.error());
+        const FileURL destination = row.appendingDirectory(fs::uniqueName("temp."));
+        const auto renamed = fileManager.renameItem(from, url, opened->get(), destination);
+        if (!renamed && renamed.error().isPosix(ENOENT) && again)
+            continue;
+        TRY(renamed);
+        return owner ? putBackIfAnothers(from, url, opened->get(), destination, *owner) : Result<void>();
+    }
+}
+
+Result<void> ZORClientConnection::judgeOwner(int directory, const FileURL& url, std::uint32_t owner) {
+    const auto item =
+        platform::openBeneathOnMount(directory, std::string(url.lastPathComponent()).c_str(), O_PATH | O_NOFOLLOW);
+    struct stat status{};
+    if (!item || ::fstat(item->get(), &status) != 0) {
+        const int number = item ? errno : item.error() == EXDEV ? EBUSY : item.error();
+        return posixError({moveFunction, __LINE__}, number, "open of %s failed: %s", url.c_str(), errorText(number));
+    }
+    // A power cut may have kept a directory that the daemon made and lost who was to own it. An empty one is nobody's
+    // loss.
+    const bool isHalfMade = status.st_uid == ::geteuid() && S_ISDIR(status.st_mode);
+    if (!isAnothers(status, owner) || (isHalfMade && services_.fileManager.disk().removeDirectory(
+                                                         directory, std::string(url.lastPathComponent()).c_str()) == 0))
+        return {};
+    return posixError({moveFunction, __LINE__}, notTheContainer,
+                      "%s belongs to user %u: it is not the container, which is user %u's", url.c_str(), status.st_uid,
+                      owner);
+}
+
+Result<void> ZORClientConnection::putBackIfAnothers(int from, const FileURL& url, int to, const FileURL& destination,
+                                                    std::uint32_t owner) {
+    const std::string name(destination.lastPathComponent());
+    struct stat status{};
+    if (::fstatat(to, name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0 || !isAnothers(status, owner))
+        return {};
+    platform::Disk& disk = services_.fileManager.disk();
+    const std::string before(url.lastPathComponent());
+    // Its place may have been taken meanwhile.
+    std::string back = before;
+    int renamed = disk.rename(to, name.c_str(), from, back.c_str(), RENAME_NOREPLACE);
+    if (renamed < 0) {
+        back = fs::uniqueName(before + ".");
+        renamed = disk.rename(to, name.c_str(), from, back.c_str(), 0);
+    }
+    services_.log.write(logLevelError, moveFunction, "A directory of user %u was put in the place of %s; %s %s%s%s",
+                        status.st_uid, url.c_str(), renamed == 0 ? "it is back as" : "it could not be put back as",
+                        ZOR_SHOWN(back), renamed == 0 ? "" : ": ", renamed == 0 ? "" : errorText(-renamed));
+    return posixError({moveFunction, __LINE__}, notTheContainer, "%s was swapped while it was taken away", url.c_str());
+}
+
+} // namespace zor

@@ -1,0 +1,237 @@
+// SPDX-License-Identifier: Apache-2.0
+// The passes that delete what earlier ones could not remove, and what is on death row: root's, and that of each other
+// file system that holds containers.
+//
+// Passes run one after another on the death-row queue and take no lock. Items are taken as the directory is read, so no
+// number of them is too large for the memory, and none that fails keeps the others. What a power cut leaves is what was
+// on death row: nothing is removed whose move here could still be undone.
+//
+// What cannot be removed goes to the directory for temporary files, as root's and closed, and marked, so that later
+// passes, of later daemons too, know it for theirs: only root can set such a mark, and names in that directory are
+// anybody's to make. Killed between the steps, it is still on death row, closed. Nothing is copied: from another file
+// system than that directory's it stays on its death row, which is closed.
+#include "fs/FileSystemDeathRow.h"
+#include "operations/StoreServices.h"
+#include "operations/ZORClientConnection.h"
+#include "os/Openat2.h"
+#include "store/Names.h"
+
+#include <cerrno>
+#include <fcntl.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+namespace zor {
+
+namespace {
+
+constexpr const char* passFunction = "deleteContainersOnDeathRowWithCompletion";
+constexpr mode_t closedMode = 0700;
+
+const char* undeletedMark() {
+    return ::geteuid() == 0 ? names::undeletedAttribute : names::undeletedAttributeUser;
+}
+
+/// Root's alone and marked, so that a later pass finds it. 0 or an errno.
+int closeAndMark(platform::Disk& disk, int directory) {
+    static constexpr std::uint8_t mark[] = {'1'};
+    int status = disk.changeOwner(directory, ::geteuid(), ::getegid());
+    if (status == 0)
+        status = disk.changeMode(directory, closedMode);
+    if (status == 0)
+        status = disk.setAttribute(directory, undeletedMark(), mark);
+    return -status;
+}
+
+/// Whether an open directory is what closeAndMark made of it.
+bool isClosedAndMarked(int directory) {
+    struct stat status{};
+    return ::fstat(directory, &status) == 0 && status.st_uid == ::geteuid() && (status.st_mode & 0777) == closedMode &&
+           ::fgetxattr(directory, undeletedMark(), nullptr, 0) > 0;
+}
+
+} // namespace
+
+/// The state of one pass.
+struct ZORClientConnection::DeletionPass {
+    std::optional<ZORError> last;
+    DeathRowReport::Left left;
+    /// Tops of mounts that have been looked at.
+    std::set<std::pair<dev_t, ino_t>> seen;
+};
+
+void ZORClientConnection::deleteContainersOnDeathRowWithCompletion(std::function<void(ErrorCode)> completion) {
+    // A pass that has not begun finds what comes until then: only who wants to be told of its end needs another. Else
+    // whoever sends something here over and over would queue passes without end, each of which keeps the daemon busy.
+    std::atomic<bool>& waits = services_.deletionPassWaits;
+    const bool isAwaited = completion != nullptr;
+    if (!isAwaited && waits.exchange(true))
+        return;
+    try {
+        ZORDispatchAsyncWithTransaction(services_.transactions, services_.deathRowQueue,
+                                        [self = shared_from_this(), completion = std::move(completion), isAwaited] {
+                                            if (!isAwaited)
+                                                self->services_.deletionPassWaits = false;
+                                            self->runDeletionPass(completion);
+                                        });
+    } catch (...) {
+        if (!isAwaited)
+            waits = false;
+        throw;
+    }
+}
+
+void ZORClientConnection::runDeletionPass(const std::function<void(ErrorCode)>& completion) {
+    const auto passed = services_.boundary.run({passFunction, __LINE__}, [&]() -> Result<void> {
+        DeletionPass pass;
+        deleteWhatIsInTemporary();
+        deleteEverythingOnDeathRow(pass);
+        for (const FileURL& place : services_.configuration.placesOfContainers())
+            deleteEverythingOnDeathRowOf(place, pass);
+        if (services_.deathRow.inTemporary)
+            for (const std::string& name : *services_.deathRow.inTemporary)
+                pass.left.add(services_.configuration.temporaryDirectory().appendingDirectory(name).path());
+        services_.deathRow.set(std::move(pass.left));
+        if (pass.last)
+            return std::move(*pass.last);
+        return {};
+    });
+    if (completion)
+        completion(passed ? ErrorCode::success : passed.error().replyCode());
+}
+
+Result<void> ZORClientConnection::forEachCondemned(int directory, const FileURL& row,
+                                                   const std::function<Result<void>(const FileURL&)>& remove,
+                                                   DeletionPass& pass) {
+    constexpr Here here{passFunction, __LINE__};
+    std::optional<ZORError> unsynced;
+    bool first = true;
+    const auto listed = services_.fileManager.forEachItemIn(
+        directory, row, ZORFileManager::Leftovers::shown, [&](int, const FileURL& item) {
+            // Where nothing keeps the order of changes, a power cut could else bring back a container that is half
+            // removed.
+            const int status = first ? services_.durability.beforeRemoval(directory) : 0;
+            first = false;
+            if (status < 0) {
+                unsynced = posixError(here, -status, "sync of %s failed: %s", row.c_str(), errorText(-status));
+                return false;
+            }
+            {
+                const platform::MutexLock judged(services_.deathRow.moving);
+            }
+            const auto removed = services_.boundary.run(here, [&] { return remove(item); });
+            if (!removed) {
+                pass.left.add(item.path());
+                pass.last = makeError(services_.log, here, ErrorCode::deathRowItemNotDestroyed, &removed.error(),
+                                      LogFlag::yes, "Failed to destroy item at: %s", item.c_str());
+            }
+            return true;
+        });
+    return unsynced ? Result<void>(std::move(*unsynced)) : listed;
+}
+
+void ZORClientConnection::deleteEverythingOnDeathRow(DeletionPass& pass) {
+    const FileURL deathRow = services_.configuration.deathrowDirectory();
+    const auto opened = services_.fileManager.resolver().openDirectory(deathRow);
+    const auto emptied =
+        opened ? forEachCondemned(
+                     opened->get(), deathRow, [&](const FileURL& item) { return _removeItemOrMoveToTempAtURL(item); },
+                     pass)
+               : Result<void>(posixError({passFunction, __LINE__}, opened.error(), "opendir of %s failed: %s",
+                                         deathRow.c_str(), errorText(opened.error())));
+    if (emptied)
+        return;
+    pass.last = emptied.error().isPosix(ENOENT)
+                    ? emptied.error()
+                    : makeError(services_.log, {passFunction, __LINE__}, ErrorCode::listForDeletionFailed,
+                                &emptied.error(), LogFlag::yes, "Failed to get items for deletion: %s : %s",
+                                deathRow.c_str(), emptied.error().text().c_str());
+}
+
+void ZORClientConnection::deleteEverythingOnDeathRowOf(const FileURL& place, DeletionPass& pass) {
+    ZORFileManager& fileManager = services_.fileManager;
+    const auto top = fs::topOfMount(fileManager.resolver(), place);
+    if (!top || !pass.seen.insert(top->identity).second)
+        return;
+    const auto row = fs::openDeathRow(top->directory.get());
+    if (!row)
+        return;
+    const FileURL url = fs::deathRowBelow(top->url);
+    const auto emptied = forEachCondemned(
+        row->get(), url, [&](const FileURL& item) { return fileManager.removeItemIn(row->get(), item); }, pass);
+    if (!emptied)
+        pass.last = makeError(services_.log, {passFunction, __LINE__}, ErrorCode::listForDeletionFailed,
+                              &emptied.error(), LogFlag::yes, "Failed to get items for deletion: %s : %s", url.c_str(),
+                              emptied.error().text().c_str());
+    const platform::MutexLock moving(services_.deathRow.moving);
+    fs::removeEmptyDeathRow(fileManager.disk(), top->directory.get());
+}
+
+Result<void> ZORClientConnection::_removeItemOrMoveToTempAtURL(const FileURL& url) {
+    ZORFileManager& fileManager = services_.fileManager;
+    const auto removed = fileManager.removeItemAtURL(url);
+    if (removed || removed.error().isPosix(ENOENT))
+        return {};
+    ZOR_LOG(services_.log, logLevelDebug, "Couldn't remove, so moving item to /tmp: %s : %s", url.c_str(),
+            removed.error().text().c_str());
+    const FileURL temporary = services_.configuration.temporaryDirectory();
+    const auto moved = moveToTemporary(url, temporary.appendingDirectory(url.lastPathComponent()));
+    if (moved)
+        return {};
+    return makeError(services_.log, ZOR_HERE, ErrorCode::moveToTemporaryFailed, &moved.error(), LogFlag::yes,
+                     "Failed to move dir: %s to: %s", url.c_str(), temporary.c_str());
+}
+
+Result<void> ZORClientConnection::moveToTemporary(const FileURL& url, const FileURL& destination) {
+    ZORFileManager& fileManager = services_.fileManager;
+    const auto item = fileManager.resolver().openDirectory(url);
+    const auto from = fileManager.resolver().openParent(url);
+    const auto to = fileManager.resolver().openParent(destination);
+    int number = !item ? item.error() : !from ? from.error() : !to ? to.error() : 0;
+    if (number == 0)
+        number = closeAndMark(fileManager.disk(), item->get());
+    if (number != 0)
+        return posixError(ZOR_HERE, number, "closing of %s failed: %s", url.c_str(), errorText(number));
+    TRY(fileManager.renameItem(from->directory.get(), url, to->directory.get(), destination));
+    if (services_.deathRow.inTemporary)
+        services_.deathRow.inTemporary->emplace(destination.lastPathComponent());
+    return {};
+}
+
+void ZORClientConnection::findInTemporary(int directory, const FileURL& temporary) {
+    auto& known = services_.deathRow.inTemporary.emplace();
+    (void)services_.fileManager.forEachItemIn(
+        directory, temporary, ZORFileManager::Leftovers::shown, [&](int, const FileURL& item) {
+            const std::string name(item.lastPathComponent());
+            if (!item.isDirectory())
+                return true;
+            const auto opened =
+                platform::openBeneathOnMount(directory, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
+            if (opened && isClosedAndMarked(opened->get()))
+                known.insert(name);
+            return true;
+        });
+}
+
+void ZORClientConnection::deleteWhatIsInTemporary() {
+    const FileURL temporary = services_.configuration.temporaryDirectory();
+    const auto directory = services_.fileManager.resolver().openDirectory(temporary);
+    if (!directory)
+        return;
+    auto& known = services_.deathRow.inTemporary;
+    if (!known)
+        findInTemporary(directory->get(), temporary);
+    std::erase_if(*known, [&](const std::string& name) {
+        const auto opened =
+            platform::openBeneathOnMount(directory->get(), name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
+        // Somebody else may have removed it, and another may have taken the name.
+        if (!opened || !isClosedAndMarked(opened->get()))
+            return true;
+        const FileURL item = temporary.appendingDirectory(name);
+        return services_.boundary
+            .run({passFunction, __LINE__}, [&] { return services_.fileManager.removeItemIn(directory->get(), item); })
+            .has_value();
+    });
+}
+
+} // namespace zor

@@ -1,0 +1,182 @@
+// SPDX-License-Identifier: Apache-2.0
+// What a launch makes of the replaces that were under way when the last daemon ended.
+//
+// A journal says where the directories of a replace were and were to go; which of them are there says how far it came.
+// `states` is the table of that. Each row's recovery is one move at the most. What its state rests on, that move or one
+// which the ended daemon made and had not synced, is on the disk before the journal can be gone: a stop in between
+// leaves another row of the table.
+//
+// A journal that cannot be settled or read stays and waits (`SettleReplaces.cc`).
+//
+// At a launch it runs on the thread that starts the daemon, before any client and before anything is cached; later
+// under the all-identifiers lock, for one journal.
+#include "operations/StoreServices.h"
+#include "operations/ZORClientConnection.h"
+#include "store/ReplaceJournal.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <iterator>
+#include <optional>
+
+namespace zor {
+
+namespace {
+
+constexpr const char* recoverFunction = "_recoverFromReplaceOperationsWithError";
+
+/// What lies in a place. What cannot be examined is unknown, and matches only where it does not matter.
+enum class Found : std::uint8_t { absent, present, unknown };
+enum class Expected : std::uint8_t { absent, present, anything };
+enum class Recovery : std::uint8_t { nothing, moveOldBack };
+
+struct State {
+    const char* label;
+    Expected old;
+    Expected destination;
+    Expected staging;
+    Recovery recovery;
+    /// Where the last move led; nullptr: nothing lies anywhere.
+    const FileURL ReplaceJournal::* settled;
+    int logLevel;
+};
+/// The first row that matches holds. Where the new one is to take the old one's very place, that place counts as the
+/// destination.
+constexpr State states[] = {
+    {"nothing had moved", Expected::present, Expected::anything, Expected::anything, Recovery::nothing,
+     &ReplaceJournal::oldUrl, logLevelNotice},
+    {"nothing was waiting any more", Expected::anything, Expected::present, Expected::absent, Recovery::nothing,
+     &ReplaceJournal::destUrl, logLevelNotice},
+    {"both had moved", Expected::anything, Expected::present, Expected::anything, Recovery::nothing,
+     &ReplaceJournal::destUrl, logLevelNotice},
+    {"nothing is left", Expected::absent, Expected::absent, Expected::absent, Recovery::nothing, nullptr,
+     logLevelError},
+    {"the old one had moved", Expected::absent, Expected::absent, Expected::anything, Recovery::moveOldBack,
+     &ReplaceJournal::oldUrl, logLevelNotice},
+};
+
+bool matches(Expected expected, Found found) {
+    switch (expected) {
+    case Expected::absent:
+        return found == Found::absent;
+    case Expected::present:
+        return found == Found::present;
+    case Expected::anything:
+        break;
+    }
+    return true;
+}
+
+Found look(ZORFileManager& fileManager, const FileURL& url) {
+    if (fileManager.itemExistsAtURL(url))
+        return Found::present;
+    return fileManager.itemDoesNotExistAtURL(url) ? Found::absent : Found::unknown;
+}
+
+/// nullptr when what matters cannot be examined.
+const State* stateOf(ZORFileManager& fileManager, const ReplaceJournal& journal) {
+    const Found destination = look(fileManager, journal.destUrl);
+    const Found old = journal.oldUrl == journal.destUrl ? Found::absent : look(fileManager, journal.oldUrl);
+    const Found staging = look(fileManager, journal.stagingUrl);
+    const auto* const found = std::ranges::find_if(states, [&](const State& state) {
+        return matches(state.old, old) && matches(state.destination, destination) && matches(state.staging, staging);
+    });
+    return found == std::end(states) ? nullptr : found;
+}
+
+} // namespace
+
+Result<void> ZORClientConnection::_recoverFromReplaceOperationsWithError() {
+    const FileURL replace = services_.configuration.replaceDirectory();
+    const auto items = services_.fileManager.urlsForItemsInDirectoryAtURL(replace);
+    if (!items) {
+        if (!items.error().isPosix(ENOENT))
+            services_.log.write(logLevelError, recoverFunction, "Failed to get items at replace URL%s : %s",
+                                replace.c_str(), items.error().text().c_str());
+        services_.waitingReplaces.setUnlisted(!items.error().isPosix(ENOENT));
+        return {};
+    }
+    services_.waitingReplaces.setUnlisted(false);
+    // A journal has its name for itself alone, so no later write removes what a stop left of this one's.
+    for (const FileURL& leftover : services_.fileManager.writeLeftoversInDirectoryAtURL(replace))
+        (void)_moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
+    std::optional<ZORError> unread;
+    std::optional<ZORError> stopped;
+    for (const FileURL& item : *items) {
+        auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(services_.log, services_.fileManager, item);
+        // It stays, with what it names in staging; the others do not hang on it.
+        const bool unreadable = !journal && ReplaceJournal::mayStillBeRead(journal.error());
+        if (unreadable)
+            unread = journal.error();
+        else if (!stopped)
+            if (auto recovered = recoverReplace(item, journal ? &*journal : nullptr); !recovered)
+                stopped = std::move(recovered).error();
+        // Found again by the next launch; until then whoever asks for what it names tries.
+        if (unreadable || stopped)
+            services_.waitingReplaces.add({.journalUrl = item,
+                                           .oldUrl = journal ? journal->oldUrl : FileURL(),
+                                           .destUrl = journal ? journal->destUrl : FileURL()});
+    }
+    if (stopped)
+        return std::move(*stopped);
+    return unread ? Result<void>(std::move(*unread)) : Result<void>();
+}
+
+Result<void> ZORClientConnection::recoverReplace(const FileURL& journalUrl, ReplaceJournal* journal) {
+    const Log& log = services_.log;
+    if (journal) {
+        journal->moveToRoot(services_.fileManager.resolver().root().canonicalPath(),
+                            services_.configuration.stagingDirectory());
+        if (log.writes(logLevelDebug))
+            log.write(logLevelDebug, recoverFunction, "Doing a replace of %s with info: %s", journalUrl.c_str(),
+                      journal->text().c_str());
+        TRY(applyReplaceJournal(*journal));
+    }
+    if (const auto moved = _moveItemAtURLToDeathRow(journalUrl, StartDeletionThread::no); !moved)
+        return makeError(log, {recoverFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
+                         LogFlag::yes, "Failed to remove replace file at %s", journalUrl.c_str());
+    services_.waitingReplaces.remove(journalUrl);
+    return {};
+}
+
+Result<void> ZORClientConnection::applyReplaceJournal(const ReplaceJournal& journal) {
+    const Log& log = services_.log;
+    const auto failed = [&](const ZORError* cause) {
+        return makeError(log, {recoverFunction, __LINE__}, ErrorCode::journalUnusable, cause, LogFlag::yes,
+                         "Failed to recover replace move: %s to %s", journal.stagingUrl.c_str(),
+                         journal.oldUrl.c_str());
+    };
+    // What cannot be examined may be there or not. The journal waits for a launch that can tell.
+    const State* const state = stateOf(services_.fileManager, journal);
+    if (!state)
+        return failed(nullptr);
+    log.write(state->logLevel, recoverFunction, "A replace of %s had stopped: %s", journal.oldUrl.c_str(),
+              state->label);
+    if (state->recovery == Recovery::moveOldBack) {
+        if (log.writes(logLevelDebug))
+            log.write(logLevelDebug, recoverFunction, "Recovering from failed replace by moving: %s to %s",
+                      journal.stagingUrl.c_str(), journal.oldUrl.c_str());
+        const auto moved = [&]() -> Result<void> {
+            ZORFileManager& fileManager = services_.fileManager;
+            const FileURL place = journal.oldUrl.deletingLastPathComponent();
+            const auto owner = services_.configuration.ownerOfClassDirectory(place);
+            if (!owner)
+                return posixError({recoverFunction, __LINE__}, EINVAL, "%s holds no containers", place.c_str());
+            const auto from =
+                TRY(fileManager.openDirectoryOf(ownerUnchanged, journal.stagingUrl.deletingLastPathComponent()));
+            const auto to = TRY(fileManager.openDirectoryOf(*owner, place));
+            TRY(fileManager.moveItem(from.get(), journal.stagingUrl, to.get(), journal.oldUrl));
+            return {};
+        }();
+        if (!moved)
+            return failed(&moved.error());
+    }
+    if (!state->settled)
+        return {};
+    const FileURL place = (journal.*state->settled).deletingLastPathComponent();
+    if (orderBetween(place, services_.configuration.replaceDirectory()) < 0)
+        return failed(nullptr);
+    return {};
+}
+
+} // namespace zor

@@ -1,0 +1,52 @@
+// SPDX-License-Identifier: Apache-2.0
+// For tests of clients: the daemon ends in the middle of a request as often as it is told, then the request succeeds.
+// The count is kept in the info of a container of its own, so it survives each end.
+#include "operations/StoreServices.h"
+#include "operations/ZORClientConnection.h"
+
+#include <unistd.h>
+
+namespace zor {
+
+Result<void> ZORClientConnection::retryTestForUser(std::uint32_t userId, std::uint64_t numCrashes) {
+    return services_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
+        constexpr const char* function = "retryTestForUser";
+        static const std::string identifier = "com.veltra.retryTest";
+        static const std::string counterKey = "CrashCounter";
+        const Log& log = services_.log;
+        const auto found = createOrLookupContainerForUser(userId, &identifier, ContainerClass::dataApplication,
+                                                          {.createIfNecessary = true, .transient = false});
+        if (!found) {
+            log.write(logLevelError, function,
+                      "Failed to create or lookup lookup existing container for retry test: %s", identifier.c_str());
+            return found.error();
+        }
+        const ContainerAddress address{.userId = userId,
+                                       .uuid = found->uuid,
+                                       .identifier = identifier,
+                                       .containerClass = ContainerClass::dataApplication};
+        std::uint64_t remaining = numCrashes;
+        if (const auto stored = infoValueForKey(&counterKey, address, UseLocking::yes)) {
+            const auto counter = static_cast<std::uint32_t>(stored->asUnsigned().value_or(0));
+            // A 0 stays behind when the last staging failed: nothing is left to be counted down.
+            remaining = counter == 0 ? 0 : counter - 1;
+        }
+        log.write(logLevelError, function, "Crashes Remaining in retry test: %llu",
+                  static_cast<unsigned long long>(remaining));
+        const plist::Value value(remaining);
+        TRY(setInfoValue(&value, &counterKey, address, UseLocking::yes));
+        if (remaining != 0) {
+            log.write(logLevelError, function, "Crashing");
+            ::_exit(0);
+        }
+        auto staged = stageForDeleteContainersWithUsers(
+            DeletionBatch::of(userId, found->uuid, identifier, ContainerClass::dataApplication), UseLocking::yes);
+        if (staged)
+            log.write(logLevelError, function, "Returning Successfully");
+        else
+            log.write(logLevelError, function, "Failed to delete retry container at : %s", found->path.c_str());
+        return staged;
+    });
+}
+
+} // namespace zor

@@ -1,0 +1,296 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "operations/ZORDataProtectionChangeOperation.h"
+
+#include "base/BlockingScope.h"
+#include "operations/StoreServices.h"
+
+#include <cerrno>
+#include <chrono>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/sysmacros.h>
+#include <thread>
+
+namespace zor {
+
+using fs::WalkEntry;
+using fs::WalkEntryKind;
+using fs::WalkStep;
+
+namespace {
+
+constexpr const char* performFunction = "performChangeOperation";
+constexpr const char* passFunction = "_runChangeOperationNeedToRetry";
+
+/// Never given, and never taken away either.
+constexpr int untouchableClass = 2;
+/// Files get this in place of class 0, which only directories can have.
+constexpr int classOfFilesForNone = 3;
+/// A retry that finds the device locked came before the queue was suspended: it need not come again at once.
+constexpr std::chrono::milliseconds retryInterval{20};
+
+unsigned long long number(ContainerClass containerClass) {
+    return static_cast<unsigned long long>(containerClass);
+}
+
+/// Absent when it cannot be told.
+std::optional<DirectoryIdentity> identityOf(int directory) {
+    struct statx status{};
+    if (::statx(directory, "", AT_EMPTY_PATH | AT_STATX_DONT_SYNC, STATX_INO | STATX_BTIME, &status) != 0)
+        return std::nullopt;
+    return DirectoryIdentity{.device = makedev(status.stx_dev_major, status.stx_dev_minor),
+                             .inode = status.stx_ino,
+                             .birthSeconds = status.stx_btime.tv_sec,
+                             .birthNanoseconds = status.stx_btime.tv_nsec};
+}
+
+} // namespace
+
+void ZORDataProtectionChangeOperation::performChangeOperation() {
+    conclude(services_.boundary.run({performFunction, __LINE__}, [&] { return attempt(); }));
+}
+
+void ZORDataProtectionChangeOperation::retry() {
+    conclude(services_.boundary.run({performFunction, __LINE__}, [&] {
+        startRetry();
+        return attempt();
+    }));
+}
+
+void ZORDataProtectionChangeOperation::startRetry() {
+    if (!retried_ && retryStartBlock_)
+        retryStartBlock_();
+    if (std::exchange(retried_, true))
+        std::this_thread::sleep_for(retryInterval);
+}
+
+Result<ZORDataProtectionChangeOperation::NeedRetry> ZORDataProtectionChangeOperation::attempt() {
+    const platform::BlockingScope blocking; // a large tree must not take one of the few threads from all clients
+    const NeedRetry needRetry = TRY(_runChangeOperationNeedToRetry());
+    if (needRetry == NeedRetry::yes && retryIfLocked_ == RetryIfLocked::yes)
+        queueRetry();
+    return needRetry;
+}
+
+void ZORDataProtectionChangeOperation::conclude(const Result<NeedRetry>& attempted) {
+    const ZORMetadata& container = *dataContainerMetadata_;
+    const bool locked = attempted && *attempted == NeedRetry::yes;
+    if (locked && retryIfLocked_ == RetryIfLocked::yes)
+        return; // another thread may be at the retry by now
+    std::optional<ZORError> error;
+    if (!attempted) {
+        error = attempted.error();
+        services_.log.write(logLevelNotice, performFunction,
+                            "Operation to update protection classes for user: %u, id: %s, containerClass: %llu to "
+                            "class %d failed with error %s",
+                            container.uid(), ZOR_SHOWN(container.identifier()), number(container.containerClass()),
+                            newDataProtectionClass_, error->text().c_str());
+    }
+    if (locked)
+        error =
+            makeError(services_.log, {performFunction, __LINE__}, ErrorCode::lockedAndNotRetried, nullptr, LogFlag::yes,
+                      "Tried to update user: %u, id: %s, containerClass: %llu to protection class %d, but was "
+                      "locked and didn't retry",
+                      container.uid(), ZOR_SHOWN(container.identifier()), number(container.containerClass()),
+                      newDataProtectionClass_);
+    if (completionBlock_)
+        completionBlock_(locked, error);
+}
+
+void ZORDataProtectionChangeOperation::queueRetry() {
+    const ZORMetadata& container = *dataContainerMetadata_;
+    services_.log.write(
+        logLevelNotice, performFunction,
+        "Retrying container protection update to %d on next unlock for user: %u, id: %s, containerClass: %llu",
+        newDataProtectionClass_, container.uid(), ZOR_SHOWN(container.identifier()),
+        number(container.containerClass()));
+    ZORDispatchAsyncWithTransaction(services_.transactions, services_.lockStateQueue,
+                                    [self = shared_from_this()] { self->retry(); });
+}
+
+Result<ZORDataProtectionChangeOperation::NeedRetry> ZORDataProtectionChangeOperation::_runChangeOperationNeedToRetry() {
+    std::vector<Item> items;
+    platform::FileDescriptor container;
+    {
+        const IdentifierLock lock(services_.locks, dataContainerMetadata_->uuid().string(), LockMode::reading);
+        TRY(checkStillThere());
+        items = existingItems();
+        container = TRY(openContainer(items));
+    }
+    const auto walked = walk(container.get(), items);
+    if (!walked && walked.error().isPosix(EPERM))
+        return NeedRetry::yes;
+    TRY(walked);
+    // Nothing may come between the look and the record: else what is recorded could be of a container that has gone.
+    const IdentifierLock lock(services_.locks, dataContainerMetadata_->uuid().string(), LockMode::writing);
+    TRY(checkStillThere());
+    const auto now = services_.fileManager.resolver().openDirectoryPath(dataContainerMetadata_->url());
+    const auto identity = now ? identityOf(now->get()) : std::nullopt;
+    if (!identity || identity != identityOf(container.get()))
+        return changedMeanwhile();
+    if (recordBlock_)
+        recordBlock_();
+    return NeedRetry::no;
+}
+
+ZORError ZORDataProtectionChangeOperation::changedMeanwhile() {
+    return makeError(services_.log, {passFunction, __LINE__}, ErrorCode::pathNotAsExpected, nullptr, LogFlag::yes,
+                     "Cancelling data protection operation because container path changed on disk. This indicates "
+                     "the app may have been updated and changed its protection level.");
+}
+
+Result<void> ZORDataProtectionChangeOperation::checkStillThere() {
+    const ZORMetadata& container = *dataContainerMetadata_;
+    // Whatever else the identifier leads to, its record may be in another's hands: it is looked for, and not looked at.
+    const auto found =
+        services_.cache.containerForUser(container.uid(), container.containerClass(), &container.identifier(), false);
+    if (!found)
+        return makeError(services_.log, {passFunction, __LINE__}, ErrorCode::notFound, &found.error(), LogFlag::yes,
+                         "Failed to lookup container to set data protection for userId: %u, identifier: %s, Class: "
+                         "%llu",
+                         container.uid(), ZOR_SHOWN(container.identifier()), number(container.containerClass()));
+    const auto same = services_.cache.containerForUser(container.uid(), container.containerClass(),
+                                                       &container.identifier(), container.uuid().string());
+    if (!same || !*same || (*same)->transient() || (*same)->url() != container.url())
+        return changedMeanwhile();
+    return {};
+}
+
+std::vector<ZORDataProtectionChangeOperation::Item> ZORDataProtectionChangeOperation::existingItems() {
+    std::vector<Item> items;
+    for (const std::string_view name : ZORGlobalConfiguration::appUserDataItemNames()) {
+        const FileURL url = dataContainerMetadata_->url().appendingDirectory(name);
+        if (services_.fileManager.itemExistsAtURL(url))
+            items.push_back({.name = std::string(name), .path = url.path()});
+    }
+    return items;
+}
+
+std::string ZORDataProtectionChangeOperation::shown(const std::vector<Item>& items) {
+    plist::Array paths;
+    for (const Item& item : items)
+        paths.emplace_back(item.path);
+    const plist::Value list(std::move(paths));
+    return plist::describe(&list);
+}
+
+Result<platform::FileDescriptor> ZORDataProtectionChangeOperation::openContainer(const std::vector<Item>& items) {
+    auto opened = services_.fileManager.resolver().openDirectory(dataContainerMetadata_->url());
+    struct stat status{};
+    if (!opened || ::fstat(opened->get(), &status) != 0) {
+        const int number = platform::neverLocked(opened ? errno : opened.error());
+        return posixError({passFunction, __LINE__}, number, "fts_open failed for %s : %s", shown(items).c_str(),
+                          errorText(number));
+    }
+    // While the change waited, another one may have come to the same place.
+    const auto identity = identityOf(opened->get());
+    if (!firstMet_)
+        firstMet_ = identity;
+    if (identity != firstMet_)
+        return changedMeanwhile();
+    owner_ = status.st_uid;
+    return std::move(*opened);
+}
+
+Result<void> ZORDataProtectionChangeOperation::walk(int container, const std::vector<Item>& items) {
+    namesMet_.forgetAll();
+    foreignNames_ = 0;
+    std::optional<ZORError> failure;
+    for (const Item& item : items) {
+        fs::TreeWalker walker(fs::WalkStatus::typeOnly);
+        const int status = walker.walk(container, item.name.c_str(), [&](const WalkEntry& entry) {
+            if (auto visited = visit(entry, item); !visited) {
+                failure = std::move(visited).error();
+                return WalkStep::stop;
+            }
+            return WalkStep::proceed;
+        });
+        if (failure)
+            return *failure;
+        if (status < 0)
+            services_.log.write(logLevelError, passFunction, "FTS returned error for %s : %s", item.path.c_str(),
+                                errorText(-status));
+    }
+    saySharedFiles();
+    return {};
+}
+
+void ZORDataProtectionChangeOperation::saySharedFiles() const {
+    const std::uint64_t left = namesMet_.unfinished() + foreignNames_;
+    if (left > 0)
+        services_.log.write(logLevelNotice, passFunction,
+                            "Left the protection class of %llu hard-linked files in %s as it is: they have names "
+                            "outside, or another owner",
+                            static_cast<unsigned long long>(left), dataContainerMetadata_->url().c_str());
+}
+
+Result<void> ZORDataProtectionChangeOperation::visit(const WalkEntry& entry, const Item& item) {
+    if (entry.onOtherFileSystem)
+        return {};
+    const auto path = [&] { return entry.depth == 0 ? item.path : item.path + '/' + entry.path(); };
+    switch (entry.kind) {
+    case WalkEntryKind::directory:
+    case WalkEntryKind::symbolicLink:
+    case WalkEntryKind::other:
+        return {};
+    case WalkEntryKind::directoryEnd:
+        return (operationType_ & protectionChange::directories) != 0 ? changeDirectory(entry, path()) : Result<void>();
+    case WalkEntryKind::file:
+        return (operationType_ & protectionChange::files) != 0 ? changeFile(entry, path()) : Result<void>();
+    case WalkEntryKind::unreadableDirectory:
+    case WalkEntryKind::noStatus:
+        break;
+    }
+    services_.log.write(logLevelError, passFunction, "FTS returned error for %s : %s", ZOR_SHOWN(path()),
+                        errorText(entry.error));
+    return {};
+}
+
+Result<void> ZORDataProtectionChangeOperation::changeDirectory(const WalkEntry& entry, const std::string& path) {
+    return setClass(entry, path, newDataProtectionClass_,
+                    [](const struct stat&, int current) { return current == untouchableClass; });
+}
+
+Result<void> ZORDataProtectionChangeOperation::changeFile(const WalkEntry& entry, const std::string& path) {
+    const std::int32_t target = newDataProtectionClass_ == 0 ? classOfFilesForNone : newDataProtectionClass_;
+    const bool keepLower = (operationType_ & protectionChange::keepLower) != 0;
+    return setClass(entry, path, target, [this, target, keepLower](const struct stat& status, int current) {
+        if (isShared(status))
+            return true;
+        return current == target || current == untouchableClass || (keepLower && target > current);
+    });
+}
+
+Result<void> ZORDataProtectionChangeOperation::setClass(const WalkEntry& entry, const std::string& path,
+                                                        std::int32_t target, const Declines& declines) {
+    mode_t mode = 0;
+    auto set = services_.fileManager.setDataProtectionClassOfEntry(
+        entry, path, target, [&](const struct stat& status, int current) {
+            mode = status.st_mode;
+            if (declines(status, current))
+                return false;
+            if (services_.log.writes(logLevelDebug))
+                services_.log.write(logLevelDebug, passFunction, "Setting protection class of %s to %d",
+                                    ZOR_SHOWN(path), target);
+            return true;
+        });
+    if (set || !set.error().isPosix(EBADF))
+        return set;
+    services_.log.write(logLevelError, passFunction,
+                        "Ignoring failure to set protection class to %d on %s (mode 0%o): %s", target, ZOR_SHOWN(path),
+                        mode, set.error().text().c_str());
+    return {};
+}
+
+bool ZORDataProtectionChangeOperation::isShared(const struct stat& status) {
+    // The container's owner can rename during the walk, so that one name is met twice; by that he reaches what is his
+    // own anyway, and nothing else.
+    if (status.st_nlink <= 1)
+        return false;
+    if (status.st_uid == owner_)
+        return !namesMet_.wasLast(status);
+    ++foreignNames_;
+    return true;
+}
+
+} // namespace zor

@@ -1,0 +1,125 @@
+// SPDX-License-Identifier: Apache-2.0
+// One change of the data-protection class of what a user keeps in a container: a pass over its files, again after each
+// unlock for as long as a lock gets in the way.
+//
+// The tree belongs to a client, who may change it during the walk. Classes are set on descriptors of what the walk met,
+// never by a name; nothing outside the container is touched. A file that has names outside is left as it is, and so is
+// one with several names that does not belong to the container's owner: he can make its names seem to be all inside.
+//
+// A pass holds the container's lock while it looks the container up and opens it, and again afterwards to see that the
+// directory which it walked lies in the container's place still, and to record the change; not in between, since every
+// lookup of any client waits for such locks. A wipe keeps path and UUID: only the directory itself tells it.
+//
+// A stop in the middle leaves some files changed and nothing recorded; the same request, sent again, does the rest.
+//
+// Held by shared_ptr: a retry that waits on the lock-state queue keeps it. It runs on one thread at a time.
+#pragma once
+
+#include "fs/NamesMet.h"
+#include "fs/TreeWalker.h"
+#include "operations/ZORClientConnection.h"
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <sys/types.h>
+#include <vector>
+
+namespace zor {
+
+/// What a change does, as bits.
+namespace protectionChange {
+inline constexpr std::int32_t directories = 1;
+inline constexpr std::int32_t files = 2;
+/// Leave a file alone when the number of its class is lower than the new one.
+inline constexpr std::int32_t keepLower = 4;
+} // namespace protectionChange
+
+/// Tells a directory from one that has its name, or its inode's number, later.
+struct DirectoryIdentity {
+    dev_t device = 0;
+    std::uint64_t inode = 0;
+    std::int64_t birthSeconds = 0; // 0 where the file system does not say
+    std::uint32_t birthNanoseconds = 0;
+    bool operator==(const DirectoryIdentity&) const = default;
+};
+
+class ZORDataProtectionChangeOperation : public std::enable_shared_from_this<ZORDataProtectionChangeOperation> {
+public:
+    enum class RetryIfLocked : bool { no, yes };
+    /// `wasLocked`: a pass met a locked device, and no retry was wanted.
+    using CompletionBlock = std::function<void(bool wasLocked, const std::optional<ZORError>& error)>;
+
+    /// initWithContainerMetadata:newClass:retryingIfLocked:changeType:. The record is the operation's own: as the
+    /// container was when the change was asked for.
+    ZORDataProtectionChangeOperation(StoreServices& services, std::shared_ptr<const ZORMetadata> dataContainerMetadata,
+                                     std::int32_t newDataProtectionClass, RetryIfLocked retryIfLocked,
+                                     std::int32_t operationType)
+        : services_(services), dataContainerMetadata_(std::move(dataContainerMetadata)),
+          newDataProtectionClass_(newDataProtectionClass), retryIfLocked_(retryIfLocked),
+          operationType_(operationType) {}
+    ZORDataProtectionChangeOperation(const ZORDataProtectionChangeOperation&) = delete;
+    ZORDataProtectionChangeOperation& operator=(const ZORDataProtectionChangeOperation&) = delete;
+
+    /// Runs once, before the first retry.
+    void setRetryStartBlock(std::function<void()> block) { retryStartBlock_ = std::move(block); }
+    /// Runs once, when a pass has changed all there is, under the container's lock, held for writing. The container is
+    /// the one that the change was asked for.
+    void setRecordBlock(std::function<void()> block) { recordBlock_ = std::move(block); }
+    /// Runs once, when the operation ends.
+    void setCompletionBlock(CompletionBlock block) { completionBlock_ = std::move(block); }
+
+    /// One pass; then the completion, or a retry on the lock-state queue.
+    void performChangeOperation();
+
+private:
+    enum class NeedRetry : bool { no, yes };
+    Result<NeedRetry> _runChangeOperationNeedToRetry();
+    void retry();
+    void startRetry();
+    /// A pass, and where it has to come again, its queueing.
+    Result<NeedRetry> attempt();
+    void queueRetry();
+    /// Calls the completion, unless a retry is queued.
+    void conclude(const Result<NeedRetry>& attempted);
+
+    /// Errors 21, 10. The caller holds the container's lock.
+    Result<void> checkStillThere();
+    ZORError changedMeanwhile();
+    struct Item {
+        std::string name;
+        std::string path;
+    };
+    std::vector<Item> existingItems();
+    static std::string shown(const std::vector<Item>& items);
+    Result<platform::FileDescriptor> openContainer(const std::vector<Item>& items);
+    Result<void> walk(int container, const std::vector<Item>& items);
+    Result<void> visit(const fs::WalkEntry& entry, const Item& item);
+    Result<void> changeDirectory(const fs::WalkEntry& entry, const std::string& path);
+    Result<void> changeFile(const fs::WalkEntry& entry, const std::string& path);
+    using Declines = std::function<bool(const struct stat& status, int current)>;
+    Result<void> setClass(const fs::WalkEntry& entry, const std::string& path, std::int32_t target,
+                          const Declines& declines);
+    /// Whether a file, met under one of its names, may be somebody else's too.
+    [[nodiscard]] bool isShared(const struct stat& status);
+    void saySharedFiles() const;
+
+    StoreServices& services_;
+    const std::shared_ptr<const ZORMetadata> dataContainerMetadata_;
+    const std::int32_t newDataProtectionClass_;
+    const RetryIfLocked retryIfLocked_;
+    const std::int32_t operationType_;
+    bool retried_ = false;
+    std::function<void()> retryStartBlock_;
+    std::function<void()> recordBlock_;
+    CompletionBlock completionBlock_;
+    std::optional<DirectoryIdentity> firstMet_;
+    // Of one pass.
+    uid_t owner_ = 0; // the container's
+    fs::NamesMet namesMet_;
+    std::uint64_t foreignNames_ = 0; // of files with several names and another owner than the container's
+};
+
+} // namespace zor

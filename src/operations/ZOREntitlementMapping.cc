@@ -1,0 +1,248 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "operations/ZOREntitlementMapping.h"
+
+#include "fs/DictionaryFile.h"
+#include "store/Names.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <ranges>
+#include <utility>
+
+namespace zor {
+
+using platform::MutexLock;
+
+namespace {
+
+constexpr const char* setFunction = "_setEntitlementDictionaryValues";
+
+} // namespace
+
+ZOREntitlementMapping::ZOREntitlementMapping(const Log& log, ZORFileManager& fileManager,
+                                             ZORGlobalConfiguration& configuration, StoreServices& services)
+    : log_(log), fileManager_(fileManager), configuration_(configuration), services_(services),
+      entitlementMappingFileUrl_(configuration.libraryDirectory().appendingFile(names::entitlementFile)),
+      unreadableFileUrl_(
+          entitlementMappingFileUrl_.deletingLastPathComponent().appendingFile(names::unreadableEntitlementFile)),
+      entitlementMappingDict_(_readEntitlementMappingFromDisk()) {}
+
+plist::Dictionary ZOREntitlementMapping::_readEntitlementMappingFromDisk() {
+    auto map = readEntitlementFile(entitlementMappingFileUrl_, fileManager_);
+    if (map)
+        return std::move(*map);
+    log_.write(logLevelError, __func__, "Failed to read entitlement mapping file at %s.  It may not exist yet",
+               entitlementMappingFileUrl_.c_str());
+    if (!map.error().isPosix(ENOENT)) {
+        log_.write(logLevelError, __func__, "%s", map.error().text().c_str());
+        if (const auto moved = moveUnreadableFileAside(); !moved)
+            log_.write(logLevelError, __func__, "%s", moved.error().text().c_str());
+    }
+    return {};
+}
+
+Result<void> ZOREntitlementMapping::moveUnreadableFileAside() {
+    fileIsUnread_ = true;
+    // An earlier loss that nobody has looked at is not written over.
+    if (fileManager_.itemExistsAtURL(unreadableFileUrl_)) {
+        log_.write(logLevelError, __func__,
+                   "%s lies there already; the unreadable file is left where it is, until the map is saved",
+                   unreadableFileUrl_.c_str());
+        return {};
+    }
+    if (!fileManager_.itemDoesNotExistAtURL(unreadableFileUrl_))
+        return posixError(ZOR_HERE, EIO, "stat of %s failed: %s", unreadableFileUrl_.c_str(), errorText(EIO));
+    TRY(fileManager_.moveItemAtURL(entitlementMappingFileUrl_, unreadableFileUrl_));
+    fileIsUnread_ = false;
+    log_.write(logLevelError, __func__,
+               "Moved it to %s. Until that file is removed, nothing is deleted for want of an entitlement",
+               unreadableFileUrl_.c_str());
+    return {};
+}
+
+bool ZOREntitlementMapping::unreadFileIsInPlace() {
+    return fileIsUnread_ && !fileManager_.itemDoesNotExistAtURL(entitlementMappingFileUrl_);
+}
+
+std::optional<FileURL> ZOREntitlementMapping::lostFile() {
+    if (!fileManager_.itemDoesNotExistAtURL(unreadableFileUrl_))
+        return unreadableFileUrl_;
+    if (unreadFileIsInPlace())
+        return entitlementMappingFileUrl_;
+    return std::nullopt;
+}
+
+Result<void> ZOREntitlementMapping::_writeEntitlementMappingToDisk() {
+    configuration_.libraryDirectory(); // makes it again should it have gone
+    auto written = unreadFileIsInPlace() ? moveUnreadableFileAside() : Result<void>();
+    if (written)
+        written = writeToURL(entitlementMappingDict_, entitlementMappingFileUrl_,
+                             writeAtomically | writeWithoutProtection, entitlementFileBytesMax, fileManager_);
+    if (!written)
+        return makeError(log_, ZOR_HERE, ErrorCode::entitlementFileNotWritten, &written.error(), LogFlag::yes,
+                         "Failed to write entitlement mapping file at %s", entitlementMappingFileUrl_.c_str());
+    fileIsUnread_ = false;
+    return {};
+}
+
+Result<void> ZOREntitlementMapping::_setEntitlementDictionaryValues(const std::vector<plist::Dictionary>& values,
+                                                                    const std::vector<std::string>& identifiers) {
+    const MutexLock held(entitlementQueue_);
+    return _onQueue_setEntitlementDictionaryValues(values, identifiers);
+}
+
+Result<void>
+ZOREntitlementMapping::_onQueue_setEntitlementDictionaryValues(const std::vector<plist::Dictionary>& values,
+                                                               const std::vector<std::string>& identifiers) {
+    if (values.size() != identifiers.size())
+        return makeError(log_, {setFunction, __LINE__}, ErrorCode::entitlementCountsDiffer, nullptr, LogFlag::yes,
+                         "Can't act on an invalid input: values count: %ld, IDs count: %ld",
+                         static_cast<long>(values.size()), static_cast<long>(identifiers.size()));
+    std::vector<std::pair<std::string, std::optional<plist::Value>>> previous;
+    const bool wasUnsaved = unsaved_;
+    for (std::size_t i = 0; i < values.size(); ++i) {
+        const bool hasValue = !values[i].empty();
+        const plist::Value* current = entitlementMappingDict_.find(identifiers[i]);
+        const plist::Dictionary* currentDictionary = current ? current->asDictionary() : nullptr;
+        const bool unchanged = hasValue ? currentDictionary && *currentDictionary == values[i] : !current;
+        if (unchanged)
+            continue;
+        previous.emplace_back(identifiers[i], current ? std::optional(*current) : std::nullopt);
+        unsaved_ = true; // and so it stays if anything below throws
+        if (hasValue)
+            entitlementMappingDict_.set(identifiers[i], values[i]);
+        else
+            entitlementMappingDict_.erase(identifiers[i]);
+        if (log_.writes(logLevelDebug)) {
+            const plist::Value shown(values[i]);
+            log_.write(logLevelDebug, setFunction, "Staging Entitlement Mapping for ID: %s : %s",
+                       ZOR_SHOWN(identifiers[i]), plist::describe(hasValue ? &shown : nullptr).c_str());
+        }
+    }
+    if (previous.empty() && !unsaved_)
+        return {};
+    auto written = _writeEntitlementMappingToDisk();
+    // No later save could succeed either: this change alone is refused.
+    const bool takenBack = !written && written.error().underlying()->isPosix(EFBIG);
+    if (takenBack) {
+        for (auto& [key, value] : previous | std::views::reverse)
+            if (value)
+                entitlementMappingDict_.set(key, std::move(*value));
+            else
+                entitlementMappingDict_.erase(key);
+    }
+    unsaved_ = takenBack ? wasUnsaved : !written;
+    if (!written)
+        log_.write(logLevelError, setFunction, "Error writing entitlement mappings to disk after set : %s",
+                   written.error().text().c_str());
+    else if (log_.writes(logLevelDebug))
+        log_.write(logLevelDebug, setFunction, "Wrote entitlement mappings to disk after set");
+    return written;
+}
+
+ZOREntitlementMapping::Identifiers ZOREntitlementMapping::_copyApplicationGroupEntitlementForIdentifier(
+    std::string_view identifier, const plist::Dictionary* entitlements, std::string_view groupKey) const {
+    const plist::Value* value = entitlements ? entitlements->find(groupKey) : nullptr;
+    if (!value)
+        return std::nullopt;
+    if (const std::string* one = value->asString())
+        return std::vector<std::string>{*one};
+    const std::string key(groupKey);
+    const std::string whose(identifier);
+    const plist::Array* array = value->asArray();
+    if (!array) {
+        log_.write(logLevelError, __func__, "Entitlement %s for %s does not contain supported types; ignoring.",
+                   key.c_str(), ZOR_SHOWN(whose));
+        return std::nullopt;
+    }
+    std::vector<std::string> identifiers;
+    for (const plist::Value& element : *array) {
+        const std::string* group = element.asString();
+        if (!group) {
+            log_.write(logLevelError, __func__, "Entitlement %s for %s contains non-string values; ignoring.",
+                       key.c_str(), ZOR_SHOWN(whose));
+            return std::nullopt;
+        }
+        identifiers.push_back(*group);
+    }
+    std::ranges::sort(identifiers);
+    identifiers.erase(std::ranges::unique(identifiers).begin(), identifiers.end());
+    return identifiers;
+}
+
+const plist::Dictionary* ZOREntitlementMapping::entitlementsOf(std::string_view identifier) const {
+    return entitlementMappingDict_.dictionary(identifier);
+}
+
+bool ZOREntitlementMapping::_onQueue_identifierHasCallerRegisteredEntitlements(std::string_view identifier) const {
+    const plist::Dictionary* flags = entitlementMappingDict_.dictionary(entitlementMapKeys::registeredByCaller);
+    return flags && flags->isTrue(identifier);
+}
+
+bool ZOREntitlementMapping::_onQueue_identifierHasSystemContainer(std::string_view identifier) const {
+    return ownsSystemContainer(entitlementMappingDict_, identifier);
+}
+
+ZOREntitlementMapping::Identifiers
+ZOREntitlementMapping::_onQueue_appGroupIdentifiersForIdentifier(std::string_view identifier) const {
+    return _copyApplicationGroupEntitlementForIdentifier(identifier, entitlementsOf(identifier),
+                                                         entitlementKeys::applicationGroups);
+}
+
+ZOREntitlementMapping::Identifiers
+ZOREntitlementMapping::_onQueue_systemGroupIdentifiersForIdentifier(std::string_view identifier) const {
+    const plist::Dictionary* entitlements = entitlementsOf(identifier);
+    Identifiers groups =
+        _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, entitlementKeys::systemGroups);
+    if (!groups || groups->empty())
+        groups = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements,
+                                                               entitlementKeys::systemGroupContainers);
+    if (groups)
+        std::erase_if(*groups, [&](const std::string& group) {
+            if (group.starts_with(systemGroupPrefix))
+                return false;
+            log_.write(logLevelError, "_onQueue_systemGroupIdentifiersForIdentifier",
+                       "System group ID %s does not have proper prefix, ignoring.", ZOR_SHOWN(group));
+            return true;
+        });
+    return groups;
+}
+
+bool ZOREntitlementMapping::entitlementsExistForIdentifier(std::string_view identifier) {
+    const MutexLock held(entitlementQueue_);
+    return entitlementMappingDict_.find(identifier) != nullptr;
+}
+
+bool ZOREntitlementMapping::identifierHasCallerRegisteredEntitlements(std::string_view identifier) {
+    const MutexLock held(entitlementQueue_);
+    return _onQueue_identifierHasCallerRegisteredEntitlements(identifier);
+}
+
+bool ZOREntitlementMapping::identifierHasSystemContainer(std::string_view identifier) {
+    const MutexLock held(entitlementQueue_);
+    return _onQueue_identifierHasSystemContainer(identifier);
+}
+
+ZOREntitlementMapping::Identifiers
+ZOREntitlementMapping::appGroupIdentifiersForIdentifier(std::string_view identifier) {
+    const MutexLock held(entitlementQueue_);
+    return _onQueue_appGroupIdentifiersForIdentifier(identifier);
+}
+
+ZOREntitlementMapping::Identifiers
+ZOREntitlementMapping::systemGroupIdentifiersForIdentifier(std::string_view identifier) {
+    const MutexLock held(entitlementQueue_);
+    return _onQueue_systemGroupIdentifiersForIdentifier(identifier);
+}
+
+plist::Dictionary ZOREntitlementMapping::entitlementMappingDict() {
+    const MutexLock held(entitlementQueue_);
+    return entitlementMappingDict_;
+}
+
+std::size_t ZOREntitlementMapping::entryCount() {
+    const MutexLock held(entitlementQueue_);
+    return entitlementMappingDict_.size();
+}
+
+} // namespace zor

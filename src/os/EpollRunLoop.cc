@@ -1,0 +1,181 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "os/EpollRunLoop.h"
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <limits>
+#include <sys/epoll.h>
+#include <sys/eventfd.h>
+#include <system_error>
+#include <unistd.h>
+
+namespace zor::platform {
+
+namespace {
+
+constexpr std::uint64_t wakeSerial = 0;
+
+int checkedDescriptor(int fd, const char* what) {
+    if (fd < 0)
+        throw std::system_error(errno, std::generic_category(), what);
+    return fd;
+}
+
+} // namespace
+
+EpollRunLoop::EpollRunLoop()
+    : epoll_(checkedDescriptor(::epoll_create1(EPOLL_CLOEXEC), "epoll_create1")),
+      wake_(checkedDescriptor(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK), "eventfd")) {
+    epoll_event event{};
+    event.events = EPOLLIN;
+    event.data.u64 = wakeSerial;
+    checkedDescriptor(::epoll_ctl(epoll_.get(), EPOLL_CTL_ADD, wake_.get(), &event), "epoll_ctl");
+}
+
+bool EpollRunLoop::watch(int fd, std::function<void()> ready) {
+    const MutexLock lock(mutex_);
+    epoll_event event{};
+    event.events = EPOLLIN;
+    event.data.u64 = ++lastSerial_;
+    if (::epoll_ctl(epoll_.get(), EPOLL_CTL_ADD, fd, &event) != 0)
+        return false;
+    watches_[lastSerial_] = {.fd = fd, .ready = std::make_shared<std::function<void()>>(std::move(ready))};
+    return true;
+}
+
+void EpollRunLoop::unwatch(int fd) {
+    // What a callback holds may unwatch in its turn when it goes: it goes after the lock.
+    std::shared_ptr<std::function<void()>> gone;
+    const MutexLock lock(mutex_);
+    for (auto it = watches_.begin(); it != watches_.end(); ++it) {
+        if (it->second.fd != fd)
+            continue;
+        gone = std::move(it->second.ready);
+        watches_.erase(it);
+        (void)::epoll_ctl(epoll_.get(), EPOLL_CTL_DEL, fd, nullptr);
+        return;
+    }
+}
+
+void EpollRunLoop::post(std::function<void()> job) {
+    {
+        const MutexLock lock(mutex_);
+        posted_.push_back(std::move(job));
+    }
+    wake();
+}
+
+unsigned EpollRunLoop::addTimer(std::function<void()> job) {
+    auto shared = std::make_shared<std::function<void()>>(std::move(job));
+    const MutexLock lock(mutex_);
+    timers_[++lastTimer_] = {.job = std::move(shared), .due = {}};
+    return lastTimer_;
+}
+
+void EpollRunLoop::removeTimer(unsigned timer) {
+    // As with a watch: what the job holds goes after the lock.
+    std::shared_ptr<std::function<void()>> gone;
+    const MutexLock lock(mutex_);
+    if (const auto found = timers_.find(timer); found != timers_.end()) {
+        gone = std::move(found->second.job);
+        timers_.erase(found);
+    }
+}
+
+void EpollRunLoop::setTimer(unsigned timer, std::chrono::milliseconds delay) {
+    const auto due = std::chrono::steady_clock::now() + delay;
+    {
+        const MutexLock lock(mutex_);
+        const auto found = timers_.find(timer);
+        if (found == timers_.end() || (found->second.due && *found->second.due <= due))
+            return;
+        found->second.due = due;
+    }
+    wake();
+}
+
+int EpollRunLoop::millisecondsToNextTimer() {
+    std::optional<std::chrono::steady_clock::time_point> next;
+    {
+        const MutexLock lock(mutex_);
+        for (const auto& [number, timer] : timers_)
+            next = !next || (timer.due && *timer.due < *next) ? timer.due : next;
+    }
+    if (!next)
+        return -1;
+    const auto left = std::chrono::ceil<std::chrono::milliseconds>(*next - std::chrono::steady_clock::now()).count();
+    return static_cast<int>(std::clamp<std::int64_t>(left, 0, std::numeric_limits<int>::max()));
+}
+
+void EpollRunLoop::runDueTimers() {
+    const auto now = std::chrono::steady_clock::now();
+    for (;;) {
+        std::shared_ptr<std::function<void()>> job;
+        {
+            const MutexLock lock(mutex_);
+            const auto found = std::ranges::find_if(
+                timers_, [&](const auto& entry) { return entry.second.due && *entry.second.due <= now; });
+            if (found == timers_.end())
+                return;
+            found->second.due.reset();
+            job = found->second.job;
+        }
+        (*job)();
+    }
+}
+
+void EpollRunLoop::stop() {
+    stop_.store(true, std::memory_order_release);
+    wake();
+}
+
+void EpollRunLoop::run() {
+    constexpr int eventsMax = 32;
+    std::array<epoll_event, eventsMax> events{};
+    while (!stop_.exchange(false, std::memory_order_acq_rel)) {
+        const int count = ::epoll_wait(epoll_.get(), events.data(), eventsMax, millisecondsToNextTimer());
+        if (count < 0 && errno != EINTR)
+            throw std::system_error(errno, std::generic_category(), "epoll_wait");
+        for (int i = 0; i < count; ++i) {
+            const std::uint64_t serial = events[static_cast<std::size_t>(i)].data.u64;
+            if (serial == wakeSerial)
+                drainWake();
+            else if (const auto ready = callbackOf(serial))
+                (*ready)();
+        }
+        runDueTimers();
+        runPosted();
+    }
+}
+
+std::shared_ptr<std::function<void()>> EpollRunLoop::callbackOf(std::uint64_t serial) {
+    const MutexLock lock(mutex_);
+    const auto found = watches_.find(serial);
+    return found == watches_.end() ? nullptr : found->second.ready;
+}
+
+void EpollRunLoop::runPosted() {
+    std::vector<std::function<void()>> jobs;
+    {
+        const MutexLock lock(mutex_);
+        jobs.swap(posted_);
+    }
+    for (std::function<void()>& job : jobs) {
+        job();
+        job = nullptr;
+    }
+}
+
+void EpollRunLoop::wake() {
+    const std::uint64_t one = 1;
+    // It fails only when the count is full, and then the loop wakes anyway.
+    (void)!::write(wake_.get(), &one, sizeof one);
+}
+
+void EpollRunLoop::drainWake() {
+    std::uint64_t count = 0;
+    (void)!::read(wake_.get(), &count, sizeof count);
+}
+
+} // namespace zor::platform

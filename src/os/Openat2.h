@@ -1,0 +1,35 @@
+// SPDX-License-Identifier: Apache-2.0
+// Opening below a directory that others may write to: no link is followed and no step leads out, whatever the tree does
+// meanwhile. Any thread.
+#pragma once
+
+#include "os/FileDescriptor.h"
+
+#include <cstdint>
+#include <expected>
+#include <sys/types.h>
+
+namespace zor::platform {
+
+/// Opens `relativePath` below `directory` (RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS; O_CLOEXEC is
+/// added). A link anywhere gives ELOOP (with O_PATH | O_NOFOLLOW a link in the last place too), a step out EXDEV.
+[[nodiscard]] std::expected<FileDescriptor, int> openBeneath(int directory, const char* relativePath, int flags,
+                                                             mode_t mode = 0);
+
+/// The same, and no mount point is crossed, not even one of the same file system: EXDEV. What is mounted there is not
+/// asked. A ".." is refused even where it stays inside.
+[[nodiscard]] std::expected<FileDescriptor, int> openBeneathOnMount(int directory, const char* relativePath, int flags);
+
+/// The same as openBeneath with O_PATH, out of the kernel's memory of names alone: no file system is asked, so none can
+/// make it wait. EAGAIN, as often as it likes, where one would have to be asked, or where the kernel has no such call.
+[[nodiscard]] std::expected<FileDescriptor, int> openBeneathRemembered(int directory, const char* relativePath,
+                                                                       int flags);
+
+/// The same as openBeneath for trees that only root writes to, such as DIR/etc: links are followed, as if `directory`
+/// were "/".
+[[nodiscard]] std::expected<FileDescriptor, int> openInRoot(int directory, const char* relativePath, int flags);
+
+/// The number of the mount that an open file lies on. Asks its file system nothing; errno on failure.
+[[nodiscard]] std::expected<std::uint64_t, int> mountIdOf(int fd);
+
+} // namespace zor::platform

@@ -1,0 +1,81 @@
+// SPDX-License-Identifier: Apache-2.0
+// The named service on a stream socket: accepts connections and has an elastic pool of threads serve them.
+//
+// The thread that finds a connection readable reads the frames, calls the handler and sends the reply itself. Memory
+// and connections are bounded (ListenerLimits.h); no peer can make a thread wait.
+//
+// ListenerAcceptor      who gets in                 ListenerConnection   one peer: frames in, replies out
+// ListenerPool          the threads, one epoll      ListenerInput/Output its buffers
+// ListenerTurns         whose turn it is
+// ListenerCharges       who uses how much           ListenerIncidents    what is counted and logged
+// PassedAlong           descriptors sent by peers
+#pragma once
+
+#include "platform/PeerIdentity.h"
+#include "platform/ServiceListener.h"
+#include "service/ListenerIncidents.h"
+#include "service/ListenerLimits.h"
+#include "service/ListenerSocket.h"
+
+#include <cstdint>
+#include <memory>
+
+namespace zor::platform {
+
+struct ListenerCore;
+
+struct ListenerOptions {
+    /// Where the socket is made (mode 0666) and, on stop, removed.
+    ListenerAddress address;
+    /// A listening socket that the service manager made; when valid it is used, and the address is not.
+    FileDescriptor passed;
+    ListenerLimits limits;
+    /// Gets lines for the log, now and then one of each kind.
+    ListenerReport report;
+};
+
+struct ListenerCounters {
+    std::uint64_t connections = 0;
+    std::uint64_t connectionsAccepted = 0;
+    std::uint64_t connectionsRefused = 0;
+    std::uint64_t messages = 0;
+    std::uint64_t brokenFrames = 0;
+    std::uint64_t foreignSenders = 0;
+    std::uint64_t connectionsDropped = 0;
+    std::uint64_t inputBytes = 0;
+    std::uint64_t outputBytes = 0;
+    std::uint64_t threads = 0;
+    std::uint64_t threadsBlocked = 0;
+    std::uint64_t threadsMost = 0;
+};
+
+class LinuxServiceListener final : public ServiceListener {
+public:
+    LinuxServiceListener(PeerIdentity& identity, ListenerOptions options);
+    ~LinuxServiceListener() override;
+
+    /// Once. errno tells why when it is false; nobody can connect to a socket of its own then.
+    bool resume(ServiceHandler handler) override;
+    /// Each connection that is still open gets its invalid event from the calling thread. Replies that come later go
+    /// nowhere.
+    void stop() override;
+
+    /// All zero before resume. Any thread, but not during resume.
+    [[nodiscard]] ListenerCounters counters() const;
+
+private:
+    class Acceptance;
+
+    /// 0 or an errno, and then something may have begun.
+    [[nodiscard]] int begin(ServiceHandler handler);
+    [[nodiscard]] int takeSocket();
+
+    PeerIdentity& identity_;
+    ListenerOptions options_;
+    bool socketIsOurs_ = false;
+    PeerSocket socket_;
+    std::unique_ptr<ListenerCore> core_;
+    std::unique_ptr<Acceptance> acceptance_;
+};
+
+} // namespace zor::platform

@@ -1,0 +1,332 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "service/ListenerConnection.h"
+
+#include "ipc/Frame.h"
+#include "plist/Binary.h"
+#include "service/ListenerCore.h"
+
+#include <exception>
+#include <sys/epoll.h>
+#include <sys/socket.h>
+#include <utility>
+
+namespace zor::platform {
+
+namespace {
+
+/// A reply is written into a buffer that its thread keeps, unless it has become larger than most replies ever are.
+constexpr std::size_t replyBufferBytesKept = std::size_t{256} * 1024;
+
+} // namespace
+
+/// The fields below the connection are guarded by the connection's mutex.
+class ListenerConnection::Channel final : public ReplyChannel {
+public:
+    explicit Channel(std::shared_ptr<ListenerConnection> owner) : connection(std::move(owner)) {}
+
+    void send(const plist::Dictionary& reply) override {
+        thread_local plist::Data frame;
+        try {
+            frame.resize(ipc::frameHeaderBytes);
+            if (plist::appendBinary(reply, frame) && frame.size() - ipc::frameHeaderBytes <= ipc::replyPayloadBytesMax)
+                connection->transmit(*this, frame);
+            else
+                connection->unwritable(*this);
+        } catch (const std::exception&) {
+            // Here, because the thread may be a queue's, which has nobody to tell.
+            connection->unwritable(*this);
+        }
+        if (frame.capacity() > replyBufferBytesKept)
+            plist::Data().swap(frame);
+    }
+
+    const std::shared_ptr<ListenerConnection> connection;
+    std::uint64_t life = 0;
+    std::uint64_t id = 0;
+    bool sent = true;
+};
+
+void ListenerConnection::open(PeerSocket socket, std::unique_ptr<Peer> peer, ListenerCharges::Account& account) {
+    bool added = false;
+    {
+        // Under the mutex to the end: an event that belongs to an earlier life may come at any moment.
+        const MutexLock lock(mutex_);
+        input_.open(core_.charges, account, peer->pid());
+        output_.open(core_.charges, account, core_.limits.outputBytesMax);
+        account_ = &account;
+        uid_ = peer->kernelUserId();
+        standIn(account.line);
+        peer_ = std::move(peer);
+        descriptor_ = socket.get();
+        socket_ = std::move(socket);
+        over_ = false;
+        open_ = true;
+        ++life_;
+        added = core_.pool.add(descriptor_, *this, EPOLLIN);
+        held_ = !added;
+    }
+    if (!added)
+        close();
+}
+
+void ListenerConnection::endAfterStop() {
+    {
+        const MutexLock lock(mutex_);
+        if (!open_)
+            return;
+        held_ = true;
+        over_ = true;
+    }
+    close();
+}
+
+void ListenerConnection::run(ListenerScratch& scratch, std::uint32_t events) {
+    {
+        const MutexLock lock(mutex_);
+        // Out of date, or another worker has it and will arm it again: nothing is lost, arming reports what is there.
+        if (!open_ || (events != 0 && held_))
+            return;
+        held_ = true;
+        if (output_.pendingBytes() > 0 && output_.flush(descriptor_) == ListenerOutput::Result::broken)
+            dropLocked();
+    }
+    Outcome outcome = Outcome::end;
+    try {
+        outcome = keepRest(serve(scratch));
+        if (outcome == Outcome::requeue)
+            return core_.pool.requeue(*this);
+    } catch (const std::exception&) {
+        // One request less is better than no daemon. Its peer learns at once that there will be no reply.
+        outcome = endWithIncident(ListenerIncident::unservable, peer_->pid());
+    }
+    if (outcome == Outcome::end || !letGo())
+        close();
+}
+
+ListenerConnection::Outcome ListenerConnection::serve(ListenerScratch& scratch) {
+    Turn turn;
+    for (;;) {
+        if (const std::optional<Outcome> outcome = serveArrived(scratch, turn))
+            return *outcome;
+        if (output_.pendingBytes() >= core_.limits.outputBytesPaused)
+            return Outcome::wait;
+        switch (input_.receive(descriptor_, scratch)) {
+        case ListenerInput::Received::bytes:
+            break;
+        case ListenerInput::Received::nothing:
+            return Outcome::wait;
+        case ListenerInput::Received::ended:
+            return Outcome::end;
+        case ListenerInput::Received::foreign:
+            return endWithOther(ListenerIncident::foreignSender);
+        case ListenerInput::Received::tooMuch:
+            return endWithIncident(ListenerIncident::tooMuchInput, static_cast<std::int64_t>(peer_->kernelUserId()));
+        }
+        if (input_.filled())
+            continue;
+        // Probably that was all; if not, arming says so at once, after others have had their turn.
+        return serveArrived(scratch, turn).value_or(Outcome::wait);
+    }
+}
+
+bool ListenerConnection::isOver(Turn& turn) const {
+    if (turn.frames == 0)
+        return false;
+    if (turn.frames >= core_.limits.framesPerTurn || core_.pool.othersWait(line()))
+        return true;
+    const auto now = std::chrono::steady_clock::now();
+    if (turn.frames == 1)
+        turn.firstServed = now;
+    return now - turn.firstServed >= core_.limits.turnMax;
+}
+
+std::optional<ListenerConnection::Outcome> ListenerConnection::serveArrived(ListenerScratch& scratch, Turn& turn) {
+    for (;;) {
+        if (over_)
+            return Outcome::end;
+        const std::span<const std::uint8_t> pending = input_.pending();
+        if (pending.size() < ipc::frameHeaderBytes)
+            return std::nullopt;
+        const ipc::FrameHeader header = ipc::decodeFrameHeader(pending.first<ipc::frameHeaderBytes>());
+        if (!header.isValidRequest())
+            return endWithOther(ListenerIncident::brokenFrame);
+        if (pending.size() - ipc::frameHeaderBytes < header.payloadBytes)
+            return std::nullopt;
+        if (output_.pendingBytes() >= core_.limits.outputBytesPaused)
+            return Outcome::wait;
+        if (isOver(turn))
+            return Outcome::requeue;
+        ++turn.frames;
+        if (!serveFrame(header, pending.subspan(ipc::frameHeaderBytes, header.payloadBytes)))
+            return endWithOther(ListenerIncident::brokenFrame);
+        input_.consume(ipc::frameHeaderBytes + header.payloadBytes);
+        scratch.messages.store(scratch.messages.load(std::memory_order_relaxed) + 1, std::memory_order_relaxed);
+    }
+}
+
+bool ListenerConnection::serveFrame(const ipc::FrameHeader& header, std::span<const std::uint8_t> payload) {
+    auto value = plist::readBinary(payload);
+    plist::Dictionary* request = value ? value->asMutableDictionary() : nullptr;
+    if (!request)
+        return false;
+    ServiceEvent event = {.kind = ServiceEvent::Kind::message, .request = std::move(*request), .reply = nullptr};
+    if (header.expectsReply())
+        event.reply = channelFor(header.id);
+    core_.handler(*this, event);
+    return true;
+}
+
+ListenerConnection::Outcome ListenerConnection::endWithOther(ListenerIncident incident) {
+    core_.incidents.happened(incident, peer_->pid());
+    ServiceEvent event = {.kind = ServiceEvent::Kind::other, .request = {}, .reply = nullptr};
+    core_.handler(*this, event);
+    return Outcome::end;
+}
+
+ListenerConnection::Outcome ListenerConnection::endWithIncident(ListenerIncident incident, std::int64_t about) {
+    core_.incidents.happened(incident, about);
+    return Outcome::end;
+}
+
+std::shared_ptr<ListenerConnection::Channel> ListenerConnection::channelFor(std::uint64_t id) {
+    // Counted once, it is ours alone. Another thread that had it may have dropped it just now, after a send under the
+    // mutex.
+    if (!channel_ || channel_.use_count() != 1)
+        channel_ = std::make_shared<Channel>(shared_from_this());
+    const MutexLock lock(mutex_);
+    channel_->life = life_;
+    channel_->id = id;
+    channel_->sent = false;
+    return channel_;
+}
+
+std::uint32_t ListenerConnection::eventsWanted() const {
+    const std::size_t pending = output_.pendingBytes();
+    if (pending == 0)
+        return EPOLLIN;
+    return pending < core_.limits.outputBytesPaused ? std::uint32_t{EPOLLIN | EPOLLOUT} : std::uint32_t{EPOLLOUT};
+}
+
+ListenerConnection::Outcome ListenerConnection::keepRest(Outcome outcome) {
+    if (outcome != Outcome::end && !input_.keep())
+        return endWithIncident(ListenerIncident::tooMuchInput, static_cast<std::int64_t>(peer_->kernelUserId()));
+    return outcome;
+}
+
+bool ListenerConnection::letGo() {
+    int descriptor = -1;
+    std::uint32_t events = 0;
+    {
+        const MutexLock lock(mutex_);
+        if (over_)
+            return false;
+        events = eventsWanted();
+        Arming expected = Arming::no;
+        if (!arming_.compare_exchange_strong(expected, Arming::underway)) {
+            // The worker that had it before is not through yet. What it arms now is out of date, and it will see that.
+            held_ = !core_.pool.rearm(descriptor_, *this, events);
+            return !held_;
+        }
+        held_ = false;
+        descriptor = descriptor_;
+    }
+    const bool armed = core_.pool.rearm(descriptor, *this, events);
+    if (arming_.exchange(Arming::no) == Arming::closesAfterwards) {
+        release();
+        return true;
+    }
+    if (armed && eventsWanted() == events)
+        return true;
+    const MutexLock lock(mutex_);
+    if (!open_ || held_)
+        return true;
+    held_ = !core_.pool.rearm(descriptor_, *this, eventsWanted());
+    return !held_;
+}
+
+void ListenerConnection::close() {
+    {
+        const MutexLock lock(mutex_);
+        over_ = true;
+    }
+    ServiceEvent event = {.kind = ServiceEvent::Kind::invalid, .request = {}, .reply = nullptr};
+    core_.handler(*this, event);
+
+    input_.close();
+    channel_.reset();
+    peer_.reset();
+    {
+        const MutexLock lock(mutex_);
+        output_.close();
+        core_.pool.remove(descriptor_);
+        open_ = false;
+        held_ = false;
+        Arming expected = Arming::underway;
+        if (arming_.compare_exchange_strong(expected, Arming::closesAfterwards))
+            return;
+    }
+    release();
+}
+
+void ListenerConnection::release() {
+    PeerSocket socket;
+    ListenerCharges::Account* account = nullptr;
+    {
+        const MutexLock lock(mutex_);
+        socket = std::move(socket_);
+        descriptor_ = -1;
+        account = std::exchange(account_, nullptr);
+    }
+    // A moment at most, but nobody should have to wait for the mutex meanwhile.
+    socket.reset();
+    core_.charges.closeConnection(*account);
+    core_.recycle(*this);
+}
+
+void ListenerConnection::cancel() {
+    const MutexLock lock(mutex_);
+    over_ = true;
+}
+
+void ListenerConnection::transmit(Channel& channel, plist::Data& frame) {
+    const MutexLock lock(mutex_);
+    if (channel.sent || channel.life != life_ || !open_ || over_)
+        return;
+    const ipc::FrameHeader header = {.payloadBytes = static_cast<std::uint32_t>(frame.size() - ipc::frameHeaderBytes),
+                                     .flags = ipc::frameIsReply,
+                                     .id = channel.id};
+    ipc::encodeFrameHeader(header, std::span(frame).first<ipc::frameHeaderBytes>());
+    const ListenerOutput::Result result = output_.write(socket_.get(), frame);
+    channel.sent = true;
+    switch (result) {
+    case ListenerOutput::Result::done:
+        return;
+    case ListenerOutput::Result::kept:
+        if (!held_ && !core_.pool.rearm(socket_.get(), *this, eventsWanted()))
+            dropLocked();
+        return;
+    case ListenerOutput::Result::tooMuch:
+        core_.incidents.happened(ListenerIncident::tooMuchOutput, static_cast<std::int64_t>(uid_));
+        return dropLocked();
+    case ListenerOutput::Result::broken:
+        return dropLocked();
+    }
+}
+
+void ListenerConnection::unwritable(Channel& channel) {
+    const MutexLock lock(mutex_);
+    if (channel.sent || channel.life != life_ || !open_ || over_)
+        return;
+    channel.sent = true;
+    core_.incidents.happened(ListenerIncident::unwritableReply, static_cast<std::int64_t>(uid_));
+    // A peer that waits for this reply has to learn that it does not come.
+    dropLocked();
+}
+
+void ListenerConnection::dropLocked() {
+    over_ = true;
+    output_.discard();
+    ::shutdown(socket_.get(), SHUT_RDWR);
+}
+
+} // namespace zor::platform

@@ -1,0 +1,121 @@
+// SPDX-License-Identifier: Apache-2.0
+// One client's connection. Objects are reused and live as long as the listener, so an event that is out of date finds
+// an object, and that the object tells it so.
+//
+// A connection is either armed in epoll, or *held* by one worker (also while it is requeued). Whoever holds it reads,
+// serves and closes; nobody else does. Replies may be sent by any thread at any time: a thread that does not hold the
+// connection arms it again under the mutex, so that the unsent rest is looked after.
+#pragma once
+
+#include "base/Mutex.h"
+#include "platform/PeerIdentity.h"
+#include "platform/ServiceListener.h"
+#include "service/ListenerIncidents.h"
+#include "service/ListenerInput.h"
+#include "service/ListenerOutput.h"
+#include "service/ListenerPool.h"
+#include "service/PassedAlong.h"
+
+#include <atomic>
+#include <chrono>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <span>
+
+namespace zor::ipc {
+struct FrameHeader;
+}
+
+namespace zor::platform {
+
+struct ListenerCore;
+
+class ListenerConnection final : public ListenerTask,
+                                 public PeerConnection,
+                                 public std::enable_shared_from_this<ListenerConnection> {
+public:
+    explicit ListenerConnection(ListenerCore& core) : core_(core) {}
+
+    /// Begins to serve. The account holds the charge of this connection and is given back at its end.
+    void open(PeerSocket socket, std::unique_ptr<Peer> peer, ListenerCharges::Account& account) ZOR_EXCLUDES(mutex_);
+    /// Ends the connection when no worker is left. Nothing happens when it has ended already.
+    void endAfterStop() ZOR_EXCLUDES(mutex_);
+
+    // ListenerTask
+    void run(ListenerScratch& scratch, std::uint32_t events) override ZOR_EXCLUDES(mutex_);
+    // PeerConnection
+    Peer& peer() override { return *peer_; }
+    void cancel() override ZOR_EXCLUDES(mutex_);
+
+private:
+    class Channel;
+
+    enum class Outcome {
+        /// Wait for the next event.
+        wait,
+        /// More is there, but others come first.
+        requeue,
+        end,
+    };
+
+    /// How much of its turn the connection has had.
+    struct Turn {
+        unsigned frames = 0;
+        /// Looked at when a second frame is at hand: most turns have one, and need no clock.
+        std::chrono::steady_clock::time_point firstServed;
+    };
+
+    Outcome serve(ListenerScratch& scratch);
+    [[nodiscard]] bool isOver(Turn& turn) const;
+    /// Keeps what has arrived of the next request, whatever the worker's scratch buffer is used for meanwhile.
+    Outcome keepRest(Outcome outcome);
+    /// Serves the frames that have arrived whole. nullopt when more has to be received.
+    std::optional<Outcome> serveArrived(ListenerScratch& scratch, Turn& turn);
+    /// False when it was no request.
+    bool serveFrame(const ipc::FrameHeader& header, std::span<const std::uint8_t> payload);
+    Outcome endWithOther(ListenerIncident incident);
+    Outcome endWithIncident(ListenerIncident incident, std::int64_t about);
+    std::shared_ptr<Channel> channelFor(std::uint64_t id) ZOR_EXCLUDES(mutex_);
+    /// Gives the connection back to epoll. False when it has to be closed instead.
+    bool letGo() ZOR_EXCLUDES(mutex_);
+    void close() ZOR_EXCLUDES(mutex_);
+    /// The end of close, and of this life.
+    void release() ZOR_EXCLUDES(mutex_);
+
+    /// Sends one frame for a channel, if that still stands for a reply of this life.
+    void transmit(Channel& channel, plist::Data& frame) ZOR_EXCLUDES(mutex_);
+    [[nodiscard]] std::uint32_t eventsWanted() const;
+    void unwritable(Channel& channel) ZOR_EXCLUDES(mutex_);
+    /// Ends the connection from any thread: whoever holds it, or the worker that its end wakes, closes it.
+    void dropLocked() ZOR_REQUIRES(mutex_);
+
+    ListenerCore& core_;
+
+    // Of whoever holds the connection.
+    ListenerInput input_;
+    std::unique_ptr<Peer> peer_;
+    /// Used again for the next request when nobody else has kept it.
+    std::shared_ptr<Channel> channel_;
+    int descriptor_ = -1;
+
+    /// No more requests are served and no more replies sent. Once set it stays so for this life.
+    std::atomic<bool> over_{false};
+
+    enum class Arming : std::uint8_t { no, underway, closesAfterwards };
+    std::atomic<Arming> arming_{Arming::no};
+
+    Mutex mutex_;
+    /// Closed only by the holder, who therefore may use descriptor_, the same number, without the mutex.
+    PeerSocket socket_ ZOR_GUARDED_BY(mutex_);
+    ListenerCharges::Account* account_ ZOR_GUARDED_BY(mutex_) = nullptr;
+    uid_t uid_ ZOR_GUARDED_BY(mutex_) = 0;
+    bool open_ ZOR_GUARDED_BY(mutex_) = false;
+    bool held_ ZOR_GUARDED_BY(mutex_) = false;
+    /// Which of the connections that this object has been; a channel belongs to one.
+    std::uint64_t life_ ZOR_GUARDED_BY(mutex_) = 0;
+    /// pendingBytes() may be read without the mutex.
+    ListenerOutput output_;
+};
+
+} // namespace zor::platform

@@ -1,0 +1,162 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "service/ListenerInput.h"
+
+#include "ipc/Frame.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+#include <sys/socket.h>
+#include <sys/uio.h>
+#include <utility>
+
+namespace zor::platform {
+
+namespace {
+
+/// Room for the sender's credentials and nothing else: descriptors that a peer sends along do not fit, and the kernel
+/// closes them without making them ours, in this thread (PassedAlong.h).
+struct ControlBuffer {
+    alignas(cmsghdr) char bytes[CMSG_SPACE(sizeof(ucred))];
+};
+
+/// 0 when the kernel does not say, or cannot (another pid namespace).
+pid_t senderOf(msghdr& message) {
+    const cmsghdr* control = CMSG_FIRSTHDR(&message);
+    if (!control || control->cmsg_level != SOL_SOCKET || control->cmsg_type != SCM_CREDENTIALS ||
+        control->cmsg_len < CMSG_LEN(sizeof(ucred)))
+        return 0;
+    ucred credentials = {};
+    std::memcpy(&credentials, CMSG_DATA(control), sizeof credentials);
+    return credentials.pid;
+}
+
+} // namespace
+
+void ListenerInput::open(ListenerCharges& charges, ListenerCharges::Account& account, pid_t peerPid) {
+    charges_ = &charges;
+    account_ = &account;
+    peerPid_ = peerPid;
+    filled_ = false;
+}
+
+void ListenerInput::close() {
+    inScratch_ = {};
+    keptBegin_ = keptEnd_ = 0;
+    [[maybe_unused]] const bool done = resizeKept(0);
+    charges_ = nullptr;
+    account_ = nullptr;
+}
+
+bool ListenerInput::resizeKept(std::size_t capacity) {
+    if (capacity == keptCapacity_)
+        return true;
+    // Before the charge: where there is no memory nothing has been charged.
+    std::unique_ptr<std::uint8_t[]> other;
+    if (capacity > 0)
+        other = std::make_unique_for_overwrite<std::uint8_t[]>(capacity);
+    if (!charges_->changeInput(*account_, keptCapacity_, capacity))
+        return false;
+    if (capacity > 0)
+        std::copy(kept_.get() + keptBegin_, kept_.get() + keptEnd_, other.get());
+    keptEnd_ -= std::exchange(keptBegin_, 0);
+    kept_ = std::move(other);
+    keptCapacity_ = capacity;
+    return true;
+}
+
+std::span<const std::uint8_t> ListenerInput::pending() const {
+    if (keptEnd_ > keptBegin_)
+        return {kept_.get() + keptBegin_, keptEnd_ - keptBegin_};
+    return inScratch_;
+}
+
+void ListenerInput::consume(std::size_t count) {
+    if (keptEnd_ == keptBegin_) {
+        inScratch_ = inScratch_.subspan(count);
+        return;
+    }
+    keptBegin_ += count;
+    if (keptBegin_ < keptEnd_)
+        return;
+    keptBegin_ = keptEnd_ = 0;
+    [[maybe_unused]] const bool done = resizeKept(0);
+}
+
+bool ListenerInput::keep() {
+    if (inScratch_.empty())
+        return true;
+    // Between the two parts there is no gap: only a frame that is kept whole has scratch bytes behind it.
+    const std::size_t before = keptEnd_ - keptBegin_;
+    if (!resizeKept(before + inScratch_.size()))
+        return false;
+    std::memcpy(kept_.get() + keptEnd_, inScratch_.data(), inScratch_.size());
+    keptEnd_ += inScratch_.size();
+    inScratch_ = {};
+    return true;
+}
+
+std::optional<ListenerInput::Room> ListenerInput::makeRoom(ListenerScratch& scratch) {
+    const std::span<const std::uint8_t> partial = pending();
+    if (partial.size() < listenerSmallInputBytes) {
+        // A small beginning is put together in the scratch buffer, as if it had just arrived.
+        if (!partial.empty())
+            std::memmove(scratch.bytes.get(), partial.data(), partial.size());
+        inScratch_ = {scratch.bytes.get(), partial.size()};
+        keptBegin_ = keptEnd_ = 0;
+        if (!resizeKept(0))
+            return std::nullopt;
+        return Room{.scratch = listenerScratchBytes - inScratch_.size()};
+    }
+    if (!keep())
+        return std::nullopt;
+    if (keptBegin_ > 0) {
+        std::memmove(kept_.get(), kept_.get() + keptBegin_, keptEnd_ - keptBegin_);
+        keptEnd_ -= std::exchange(keptBegin_, 0);
+    }
+    const ipc::FrameHeader header = ipc::decodeFrameHeader(
+        std::span<const std::uint8_t, ipc::frameHeaderBytes>(kept_.get(), ipc::frameHeaderBytes));
+    const std::size_t frameBytes = ipc::frameHeaderBytes + header.payloadBytes;
+    // At most twice what has arrived, and never past the end of the frame.
+    if (keptCapacity_ == keptEnd_ && !resizeKept(std::min(frameBytes, 2 * keptEnd_)))
+        return std::nullopt;
+    // Until the frame is whole nothing may lie behind it.
+    return Room{.kept = std::min(frameBytes, keptCapacity_) - keptEnd_,
+                .scratch = keptCapacity_ >= frameBytes ? listenerScratchBytes : 0};
+}
+
+ListenerInput::Received ListenerInput::receive(int socket, ListenerScratch& scratch) {
+    filled_ = false;
+    const std::optional<Room> room = makeRoom(scratch);
+    if (!room)
+        return Received::tooMuch;
+    iovec parts[2] = {{.iov_base = kept_.get() + keptEnd_, .iov_len = room->kept},
+                      {.iov_base = scratch.bytes.get() + inScratch_.size(), .iov_len = room->scratch}};
+    ControlBuffer control;
+    msghdr message = {};
+    message.msg_iov = room->kept > 0 ? &parts[0] : &parts[1];
+    message.msg_iovlen = room->kept > 0 && room->scratch > 0 ? 2 : 1;
+    message.msg_control = control.bytes;
+    message.msg_controllen = sizeof control.bytes;
+    ssize_t received = -1;
+    scratch.receiving.begin();
+    do {
+        received = ::recvmsg(socket, &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+    } while (received < 0 && errno == EINTR);
+    scratch.receiving.end();
+    if (received < 0)
+        return errno == EAGAIN || errno == EWOULDBLOCK ? Received::nothing : Received::ended;
+    if (received == 0)
+        return Received::ended;
+    const pid_t sender = senderOf(message);
+    if (sender != 0 && sender != peerPid_)
+        return Received::foreign;
+    const auto count = static_cast<std::size_t>(received);
+    const std::size_t toKept = std::min(count, room->kept);
+    keptEnd_ += toKept;
+    inScratch_ = {scratch.bytes.get(), inScratch_.size() + count - toKept};
+    filled_ = count == room->kept + room->scratch;
+    return Received::bytes;
+}
+
+} // namespace zor::platform

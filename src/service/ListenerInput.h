@@ -1,0 +1,78 @@
+// SPDX-License-Identifier: Apache-2.0
+// The bytes of one connection that have arrived and are not served yet.
+//
+// They are received into the worker's scratch buffer and looked at there; only what is left when the worker turns to
+// another connection is kept, in a buffer that never grows faster than bytes arrive and is charged to the user. So an
+// idle connection keeps none. A large request is received straight into that buffer. Belongs to the worker that has the
+// connection.
+#pragma once
+
+#include "service/ListenerCharges.h"
+#include "service/ListenerPool.h"
+
+#include <cstddef>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <span>
+#include <sys/types.h>
+
+namespace zor::platform {
+
+class ListenerInput {
+public:
+    ListenerInput() = default;
+    ListenerInput(const ListenerInput&) = delete;
+    ListenerInput& operator=(const ListenerInput&) = delete;
+
+    void open(ListenerCharges& charges, ListenerCharges::Account& account, pid_t peerPid);
+    /// Gives the buffer and its charge back.
+    void close();
+
+    enum class Received {
+        bytes,
+        /// Nothing has arrived.
+        nothing,
+        /// The stream has ended or broken.
+        ended,
+        /// The bytes were sent by another process than the peer. They are not kept.
+        foreign,
+        /// The user has too much buffered.
+        tooMuch,
+    };
+    /// Receives once. What is pending is the beginning of one frame with a valid header, or less.
+    [[nodiscard]] Received receive(int socket, ListenerScratch& scratch);
+    /// Whether the last receive took all it had room for, so that there may be more.
+    [[nodiscard]] bool filled() const { return filled_; }
+
+    /// The bytes to look at. A frame that has arrived whole lies in them whole. After consuming one, ask again.
+    [[nodiscard]] std::span<const std::uint8_t> pending() const;
+    void consume(std::size_t count);
+
+    /// Makes what is pending independent of the scratch buffer. False when the user has too much buffered.
+    [[nodiscard]] bool keep();
+
+private:
+    /// Where the next bytes go: first behind what is kept, then into the scratch buffer behind what lies there.
+    struct Room {
+        std::size_t kept = 0;
+        std::size_t scratch = 0;
+    };
+    /// Puts what is pending where the rest of it can be received. nullopt when the user has too much buffered.
+    [[nodiscard]] std::optional<Room> makeRoom(ListenerScratch& scratch);
+    [[nodiscard]] bool resizeKept(std::size_t capacity);
+
+    ListenerCharges* charges_ = nullptr;
+    ListenerCharges::Account* account_ = nullptr;
+    pid_t peerPid_ = 0;
+    bool filled_ = false;
+
+    // In order: first what is kept, then what lies in the scratch buffer.
+    std::unique_ptr<std::uint8_t[]> kept_;
+    std::size_t keptCapacity_ = 0;
+    std::size_t keptBegin_ = 0;
+    std::size_t keptEnd_ = 0;
+    std::span<const std::uint8_t> inScratch_;
+};
+
+} // namespace zor::platform

@@ -1,0 +1,103 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "store/ReplaceJournal.h"
+
+#include "fs/DictionaryFile.h"
+
+#include <array>
+#include <cerrno>
+
+namespace zor {
+
+namespace {
+
+constexpr std::string_view oldKey = "ZORReplaceOperationOldURL";
+constexpr std::string_view newKey = "ZORReplaceOperationNewURL";
+constexpr std::string_view stagingKey = "ZORReplaceOperationStagingURL";
+constexpr std::string_view destKey = "ZORReplaceOperationDestURL";
+
+constexpr std::string_view fileSuffix = ".plist";
+
+/// Four paths; each may have 4,096 bytes.
+constexpr std::size_t journalBytesMax = std::size_t{64} << 10;
+
+std::string shownOf(const plist::Dictionary& content, std::string_view key) {
+    return plist::describe(content.find(key));
+}
+
+} // namespace
+
+FileURL ReplaceJournal::urlFor(const FileURL& replaceDirectory, const UUID& uuid) {
+    return replaceDirectory.appendingFile(uuid.string() + std::string(fileSuffix));
+}
+
+std::string_view ReplaceJournal::stagingNameFor(const FileURL& url) {
+    std::string_view name = url.lastPathComponent();
+    if (name.ends_with(fileSuffix))
+        name.remove_suffix(fileSuffix.size());
+    return name;
+}
+
+Result<void> ReplaceJournal::_writeToDiskReplaceAt(const Log& log, ZORFileManager& fileManager,
+                                                   const FileURL& url) const {
+    if (oldUrl.empty() || newUrl.empty() || stagingUrl.empty() || destUrl.empty())
+        return makeError(log, ZOR_HERE, ErrorCode::journalValuesInvalid, nullptr, LogFlag::yes,
+                         "Invalid Replace File Info: old: %s, new: %s, staging: %s, dest: %s", oldUrl.c_str(),
+                         newUrl.c_str(), stagingUrl.c_str(), destUrl.c_str());
+    const plist::Dictionary content{{std::string(oldKey), oldUrl.path()},
+                                    {std::string(newKey), newUrl.path()},
+                                    {std::string(stagingKey), stagingUrl.path()},
+                                    {std::string(destKey), destUrl.path()}};
+    const auto written =
+        writeToURL(content, url, writeAtomically | writeWithoutProtection, journalBytesMax, fileManager);
+    if (!written)
+        return makeError(log, ZOR_HERE, ErrorCode::propertyListNotWritten, &written.error(), LogFlag::yes,
+                         "Failed to write replace dictionary to URL %s", url.c_str());
+    return {};
+}
+
+Result<ReplaceJournal> ReplaceJournal::_readAndValidateReplaceFileAtUrl(const Log& log, ZORFileManager& fileManager,
+                                                                        const FileURL& url) {
+    const auto content = readDictionaryAtURL(url, journalBytesMax, fileManager);
+    if (!content)
+        return makeError(log, ZOR_HERE, ErrorCode::journalUnusable, &content.error(), LogFlag::yes,
+                         "Failed to read replace file at URL %s", url.c_str());
+    std::array<FileURL, 4> urls;
+    const std::array keys = {oldKey, newKey, stagingKey, destKey};
+    for (std::size_t i = 0; i < keys.size(); ++i) {
+        const std::string* path = content->string(keys[i]);
+        if (!path || !path->starts_with('/') || containsDotDotPathComponents(*path))
+            return makeError(log, ZOR_HERE, ErrorCode::journalUnusable, nullptr, LogFlag::yes,
+                             "Invalid replace data: Old: %s, New: %s, Staging: %s, Dest: %s",
+                             shownOf(*content, oldKey).c_str(), shownOf(*content, newKey).c_str(),
+                             shownOf(*content, stagingKey).c_str(), shownOf(*content, destKey).c_str());
+        urls[i] = FileURL::directory(*path);
+    }
+    return ReplaceJournal{.oldUrl = urls[0], .newUrl = urls[1], .stagingUrl = urls[2], .destUrl = urls[3]};
+}
+
+bool ReplaceJournal::mayStillBeRead(const ZORError& readFailure) {
+    const ZORError* const cause = readFailure.underlying();
+    return cause && (cause->isOwnShortage() || cause->isPosix(EIO));
+}
+
+void ReplaceJournal::moveToRoot(const std::string& rootPath, const FileURL& stagingDirectory) {
+    const std::string root = rootPath == "/" ? "" : rootPath;
+    const std::string tail =
+        stagingDirectory.path().substr(root.size()) + "/" + std::string(stagingUrl.lastPathComponent());
+    const std::string& staging = stagingUrl.path();
+    if (!staging.ends_with(tail))
+        return;
+    const std::string oldRoot = staging.substr(0, staging.size() - tail.size());
+    if (oldRoot == root)
+        return;
+    for (FileURL* url : {&oldUrl, &newUrl, &stagingUrl, &destUrl})
+        if (url->path().starts_with(oldRoot + "/"))
+            *url = FileURL::directory(root + url->path().substr(oldRoot.size()));
+}
+
+std::string ReplaceJournal::text() const {
+    return "old: " + oldUrl.path() + ", new: " + newUrl.path() + ", staging: " + stagingUrl.path() +
+           ", dest: " + destUrl.path();
+}
+
+} // namespace zor
