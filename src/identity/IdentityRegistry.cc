@@ -2,11 +2,11 @@
 #include "identity/IdentityRegistry.h"
 
 #include "base/Format.h"
+#include "os/CoarseClock.h"
 #include "os/Names.h"
 #include "plist/Unite.h"
 
 #include <algorithm>
-#include <ctime>
 #include <fcntl.h>
 #include <map>
 
@@ -20,12 +20,6 @@ constexpr std::int64_t lookAgainMilliseconds = 20;
 /// All files together; one of the usual size takes some hundred bytes.
 constexpr std::size_t allBytesMax = std::size_t{64} << 20;
 constexpr int levelError = 3;
-
-std::int64_t coarseMilliseconds() {
-    timespec now{};
-    ::clock_gettime(CLOCK_MONOTONIC_COARSE, &now);
-    return std::int64_t{now.tv_sec} * 1000 + now.tv_nsec / 1'000'000;
-}
 
 std::shared_ptr<const RegistryEntry> entryNamed(const IdentityRegistry::Snapshot& snapshot, const std::string& name) {
     const auto found = std::ranges::find(snapshot.entries, name, &IdentityRegistry::Registered::fileName);
@@ -61,8 +55,7 @@ std::optional<FileId> IdentityRegistry::executableAt(const std::string& path) {
     return FileId{.device = status.st_dev, .inode = status.st_ino};
 }
 
-void IdentityRegistry::lookIfDue() {
-    const std::int64_t now = coarseMilliseconds();
+void IdentityRegistry::lookIfDue(std::int64_t now) {
     std::int64_t due = dueMilliseconds_.load(std::memory_order_relaxed);
     // Of the threads that come by, one does it; the others go on with what is known.
     if (now < due || !dueMilliseconds_.compare_exchange_strong(due, now + lookEveryMilliseconds))

@@ -61,8 +61,8 @@ public:
     [[nodiscard]] std::uint64_t generation() const { return generation_.load(std::memory_order_acquire); }
     [[nodiscard]] std::shared_ptr<const Snapshot> snapshot() const ZOR_EXCLUDES(publishing_);
 
-    /// For every message: looks at everything again when the last look is a second old.
-    void lookIfDue() ZOR_EXCLUDES(reading_);
+    /// For every message: looks at everything again when the last look is a second old. `now` is coarseMilliseconds().
+    void lookIfDue(std::int64_t now) ZOR_EXCLUDES(reading_);
     /// For every judgement: takes up pending notices.
     void takeNotices() ZOR_EXCLUDES(reading_);
     /// For a peer that no entry names: looks at everything again, unless that was done a moment ago. Whether it did.

@@ -3,6 +3,7 @@
 
 #include "base/Shortage.h"
 #include "identity/CgroupUnit.h"
+#include "os/CoarseClock.h"
 #include "os/SmallFile.h"
 
 #include <cerrno>
@@ -19,6 +20,8 @@ namespace {
 
 constexpr std::size_t cgroupBytesMax = 64 * 1024;
 constexpr const char* executableLink = "exe";
+/// A peer pays for a look at its executable, some microseconds, at most once in this time.
+constexpr std::int64_t examineEveryMilliseconds = 20;
 
 std::string whyUnexamined(int error) {
     if (error == ESRCH || error == ENOENT || error == EBADF)
@@ -29,9 +32,16 @@ std::string whyUnexamined(int error) {
 } // namespace
 
 Identity LinuxPeer::identify(Explain explain) {
-    registry_.lookIfDue();
+    const std::int64_t begin = coarseMilliseconds();
+    registry_.lookIfDue(begin);
     Identity identity{
         .pid = accepted_.pid, .effectiveUserId = accepted_.reportedUserId, .grant = nullptr, .explanation = {}};
+    if (explain == Explain::no && begin < examineAtMilliseconds_ && registry_.generation() == judgedGeneration_ &&
+        accepted_.addressSpace.lives()) {
+        identity.grant = judgedGrant_;
+        return identity;
+    }
+    examineAtMilliseconds_ = 0;
     const auto now = executableOf(accepted_.process.get());
     hasExecutedAnother_ = hasExecutedAnother_ || (now && !isAsAccepted(*now));
     if (!now || hasExecutedAnother_) {
@@ -42,6 +52,8 @@ Identity LinuxPeer::identify(Explain explain) {
                 now ? "the process has executed another program since it connected" : whyUnexamined(now.error());
         return identity;
     }
+    if (accepted_.addressSpace.lives())
+        examineAtMilliseconds_ = begin + examineEveryMilliseconds;
     if (explain == Explain::no && registry_.generation() == judgedGeneration_) {
         identity.grant = judgedGrant_;
         return identity;

@@ -2,19 +2,22 @@
 // One connected process, pinned: the descriptor of its /proc directory stays with that very process, so nobody who is
 // given its pid later is taken for it.
 //
-// Per message, while nothing changed: one statx of "exe" (which file the process runs now) and a few comparisons. When
-// the registry has changed, it is judged anew. A process that has executed another file since it was accepted is
-// granted nothing, and never again: what it sends now may have been begun by the program of before. The same file
-// executed again changes nothing, unless it has a set-ID bit and gives a user or group that the process did not connect
-// with; that is looked at for such files alone, and there it tells also of a program that was executed between the
-// connect and the accept. Whatever cannot be examined (the process has ended, or belongs to somebody whom a daemon that
-// is not root may not look at) is granted nothing.
+// Per message, while nothing changed: one look whether the process has left its address space, as it does to execute
+// another program (AddressSpace.h), and a few comparisons. Each time that it may have, that the registry has changed,
+// and that `examineEveryMilliseconds` are over, which bounds what an address space that is shared can hide: one statx
+// of "exe" (which file the process runs now). When the registry has changed, it is judged anew. A process that has
+// executed another file since it was accepted is granted nothing, and never again: what it sends now may have been
+// begun by the program of before. The same file executed again changes nothing, unless it has a set-ID bit and gives a
+// user or group that the process did not connect with; that is looked at for such files alone, and there it tells also
+// of a program that was executed between the connect and the accept. Whatever cannot be examined (the process has
+// ended, or belongs to somebody whom a daemon that is not root may not look at) is granted nothing.
 //
 // Not told apart: a program without set-ID bits that is executed before the accept, and one that executes another,
 // which executes it again, between two messages. Both run under the uid that connected, and to whoever has that uid
 // their powers are open anyway. One thread at a time.
 #pragma once
 
+#include "identity/AddressSpace.h"
 #include "identity/IdentityRegistry.h"
 #include "os/FileDescriptor.h"
 #include "platform/PeerIdentity.h"
@@ -48,6 +51,8 @@ public:
         std::uint32_t reportedUserId = 0;
         /// /proc/PID, certain to be the process that connected; invalid when that one had ended.
         FileDescriptor process;
+        /// Its own, opened before `executable` was looked at.
+        AddressSpace addressSpace;
         /// Absent when it could not be examined.
         std::optional<FileId> executable;
         std::optional<std::string> securityLabel;
@@ -80,6 +85,8 @@ private:
     const Accepted accepted_;
     IdentityRegistry& registry_;
     bool hasExecutedAnother_ = false;
+    /// Until then, by the coarse clock, the last judgement may hold without a look at the executable.
+    std::int64_t examineAtMilliseconds_ = 0;
     // The last judgement, and the generation that it rests on.
     std::uint64_t judgedGeneration_ = 0;
     std::shared_ptr<const IdentityGrant> judgedGrant_;

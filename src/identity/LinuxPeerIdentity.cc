@@ -137,8 +137,10 @@ std::unique_ptr<Peer> LinuxPeerIdentity::peerOfSocket(int socket) {
         errno = process.error();
         return nullptr;
     }
+    AddressSpace addressSpace;
     std::optional<FileId> executable;
     if (process->valid()) {
+        addressSpace = AddressSpace::of(process->get());
         const auto now = LinuxPeer::executableOf(process->get());
         if (!now && isOwnShortage(now.error())) {
             errno = now.error();
@@ -153,6 +155,7 @@ std::unique_ptr<Peer> LinuxPeerIdentity::peerOfSocket(int socket) {
                                                            .gid = credentials.gid,
                                                            .reportedUserId = isOwner ? 0 : credentials.uid,
                                                            .process = std::move(*process),
+                                                           .addressSpace = std::move(addressSpace),
                                                            .executable = executable,
                                                            .securityLabel = securityLabelOf(socket)},
                                        registry_);

@@ -2,6 +2,7 @@
 // Who is behind a connected socket: what the kernel recorded when it connected, and the process itself. Any thread.
 #pragma once
 
+#include "identity/AddressSpace.h"
 #include "identity/IdentityRegistry.h"
 #include "platform/PeerIdentity.h"
 
@@ -12,7 +13,9 @@ public:
     /// `daemonUserId` is the uid that this process runs under. A daemon that is not root reports its own uid and root's
     /// as 0: on its root it is the owner.
     LinuxPeerIdentity(IdentityRegistry& registry, uid_t daemonUserId)
-        : registry_(registry), daemonUserId_(daemonUserId) {}
+        : registry_(registry), daemonUserId_(daemonUserId) {
+        (void)AddressSpace::isTold();
+    }
 
     /// Whether /proc is of this process's own pid namespace: in another's, numbers are other processes'. A daemon for
     /// which it is not cannot tell its peers apart.

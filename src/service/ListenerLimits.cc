@@ -7,8 +7,8 @@ namespace zor::platform {
 
 namespace {
 
-/// The socket, and the directory of the process in /proc.
-constexpr std::size_t descriptorsPerConnection = 2;
+/// The socket, the directory of the process in /proc, and its address space.
+constexpr std::size_t descriptorsPerConnection = 3;
 /// Not for connections: a quarter, which is more than the threads that run at once take for their walks, and at least
 /// what an idle daemon and all upcall connections take, unless that is more than half.
 constexpr std::size_t shareOfOwn = 4;

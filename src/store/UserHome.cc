@@ -2,28 +2,23 @@
 #include "store/UserHome.h"
 
 #include "base/ZORError.h"
+#include "os/CoarseClock.h"
 
 #include <cerrno>
 #include <climits>
 #include <cstdlib>
-#include <ctime>
 #include <memory>
 #include <string>
 
 namespace zor {
 
+using platform::coarseMilliseconds;
 using platform::MutexLock;
 
 namespace {
 
 /// How long a home that was there is taken to be there still by who only reads what is cached.
 constexpr std::int64_t lookEveryMilliseconds = 1000;
-
-std::int64_t coarseMilliseconds() {
-    timespec now{};
-    ::clock_gettime(CLOCK_MONOTONIC_COARSE, &now);
-    return std::int64_t{now.tv_sec} * 1000 + now.tv_nsec / 1'000'000;
-}
 
 std::expected<FileURL, int> resolved(const platform::PasswordEntry& entry, fs::BoundedQuestion& question) {
     // A home may be reached through links that its administrator made; below it, none is followed.

@@ -4,6 +4,7 @@
 // "agent" is registered, "other" is not.
 #include "platform/PeerProcess.h"
 
+#include <fcntl.h>
 #include <sched.h>
 #include <sys/mount.h>
 #include <sys/prctl.h>
@@ -88,6 +89,36 @@ TEST(PeerThreat, AProgramThatGivesAGroup) {
     const PeerProcess process(world.server, world.program("sleeper"),
                               {.prepare = [] { return ::setresgid(given, given, given) == 0; }, .argument = "1000"});
     EXPECT_EQ(who(*world.peerOf(process)), "sleeper");
+}
+
+// A peer that executes another program while a process that it made still shares its address space is found out all
+// the same, a moment later: the peer is this test, registered, which shares its memory with a child and becomes
+// "other".
+TEST(PeerThreat, AnAddressSpaceThatOutlivesTheProgram) {
+    PeerWorld world;
+    const std::string self = std::filesystem::read_symlink("/proc/self/exe");
+    world.test.replace(PeerWorld::pathOf("self.plist"), "<plist version=\"1.0\"><dict><key>Executable</key><string>" +
+                                                            self + "</string><key>Identifier</key><string>self" +
+                                                            "</string></dict></plist>");
+    int ends[2] = {};
+    ASSERT_EQ(::pipe2(ends, O_CLOEXEC), 0);
+    const FileDescriptor reading(ends[0]);
+    FileDescriptor writing(ends[1]);
+    alignas(16) static char stack[64 * 1024];
+    const auto share = [&] {
+        char byte = 0;
+        const int connection = ::socket(AF_UNIX, SOCK_STREAM, 0);
+        const auto sleeper = [](void*) { return ::prctl(PR_SET_PDEATHSIG, SIGKILL) + ::pause(); };
+        return ::clone(sleeper, stack + sizeof stack, CLONE_VM, nullptr) > 0 && world.server.connect(connection) == 0 &&
+               ::read(reading.get(), &byte, 1) == 1;
+    };
+    const PeerProcess process(world.server, world.program("other"),
+                              {.connects = PeerStart::Connects::no, .prepare = share, .runs = self});
+    const FileDescriptor accepted = world.server.accept();
+    const auto peer = world.identity.peerOfSocket(accepted.get());
+    EXPECT_EQ(who(*peer), "self");
+    ASSERT_EQ(::write(writing.get(), "x", 1), 1);
+    EXPECT_TRUE(eventually([&] { return who(*peer) == "-"; }));
 }
 
 // Numbers of another pid namespace are nobody's: the first process of one, which sees the /proc of outside, is not the
