@@ -3,6 +3,7 @@
 // Tests make these smaller, and so does a process that may have few descriptors; nothing else changes them.
 #pragma once
 
+#include "base/UserNumbers.h"
 #include "ipc/Limits.h"
 
 #include <chrono>
@@ -11,6 +12,9 @@
 namespace zor::platform {
 
 struct ListenerLimits {
+    /// All users that the system does not know count as one.
+    static constexpr unsigned strangers = 1;
+
     /// The limits of a process that may have so many descriptors open: no crowd of connections takes those that the
     /// daemon's work, the upcall and the status need, nor what is kept for the owners.
     [[nodiscard]] static ListenerLimits forDescriptors(std::size_t descriptorsMax);
@@ -47,11 +51,12 @@ struct ListenerLimits {
 
     /// Threads that run handlers at once; 0 means one for each processor, and no fewer than 2.
     unsigned threadsRunning = 0;
-    /// Threads in all, those included that wait inside a handler.
-    unsigned threadsMax = 64;
-    /// Requests of any one user that does not own the root under way at once: several users whose requests all wait for
-    /// ever leave threads to the others.
+    /// Requests of any one user that does not own the root under way at once: a user whose requests all wait for ever
+    /// leaves threads to the others.
     unsigned threadsMaxPerUser = 16;
+    /// Threads in all, those included that wait inside a handler: each user's share, and one more for the owners of the
+    /// root and the system's own users, so that all other users together leave them that.
+    unsigned threadsMax = threadsMaxPerUser * (lastMobileUserId - firstMobileUserId + 1 + strangers) + threadsMaxPerUser;
     /// A thread that is not needed ends after this time.
     std::chrono::milliseconds threadIdle{5000};
     /// How long a handler may wait unannounced before another thread takes its place.

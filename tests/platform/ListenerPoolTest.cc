@@ -92,6 +92,7 @@ TEST(ListenerPool, GrowsWhileHandlersWaitAndShrinksAfterwards) {
         SCOPED_TRACE(announced == Announced::yes ? "announced" : "found out");
         ListenerWorld world;
         world.limits.threadsRunning = 2;
+        world.limits.threadsMax = 64;
         world.limits.threadIdle = std::chrono::milliseconds(200);
         Blocked blocked(world, announced);
         RawClient other = world.connect();

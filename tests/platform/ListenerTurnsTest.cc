@@ -84,27 +84,32 @@ TEST_F(TurnsByUser, NotByConnection) {
     }
 }
 
-// Goal: a user whose requests wait for ever does not take all threads; what waits behind them is served afterwards.
+// Goal: users whose requests wait for ever, all there can be, leave threads to root and to the system's users; what
+// waits behind them is served afterwards. Method: each asks for more than its share; the handler waits.
 TEST_F(TurnsByUser, LeaveThreadsToOthers) {
-    world.limits.threadsMax = 6;
-    world.limits.threadsMaxPerUser = 3;
+    const unsigned share = world.limits.threadsMaxPerUser;
     std::counting_semaphore<> gate(0);
     world.start([&](PeerConnection& connection, ServiceEvent& event) {
-        if (userOf(connection) == greedy) {
+        if (userOf(connection) >= greedy) {
             const BlockingScope blocking;
             gate.acquire();
         }
         event.reply->send(event.request);
     });
-    std::vector<RawClient> stuck = connectAs(greedy, 12);
-    for (RawClient& client : stuck)
-        ASSERT_TRUE(client.send(numbered(1), 1));
-    EXPECT_TRUE(eventually([&] { return world.counts.messages == 3; }));
-    for (const uid_t uid : {modest, uid_t{0}})
+    std::vector<RawClient> stuck;
+    for (const uid_t uid : {501, 502, 503, 504, 505, 506, 507, 508, 509, 510, 100'000}) {
+        for (RawClient& client : connectAs(uid, share + 1)) {
+            ASSERT_TRUE(client.send(numbered(1), 1));
+            stuck.push_back(std::move(client));
+        }
+    }
+    const int underWay = static_cast<int>(share) * 11;
+    EXPECT_TRUE(eventually([&] { return world.counts.messages == underWay; }));
+    for (const uid_t uid : {uid_t{33}, uid_t{0}})
         for (int i = 0; i < 20; ++i)
             ASSERT_TRUE(world.connectAs(uid).isServed());
-    EXPECT_EQ(world.counts.messages, 43);
-    gate.release(12);
+    EXPECT_EQ(world.counts.messages, underWay + 40);
+    gate.release(static_cast<std::ptrdiff_t>(stuck.size()));
     for (RawClient& client : stuck)
         EXPECT_TRUE(client.receives(1, numbered(1)));
 }
