@@ -9,6 +9,7 @@
 #include "os/LinuxDisk.h"
 #include "support/FaultLoop.h"
 #include "support/FileTree.h"
+#include "support/HangingFileSystem.h"
 #include "support/LongRun.h"
 #include "support/PowerCut.h"
 #include "support/ProcessResources.h"
@@ -699,24 +700,41 @@ protected:
 };
 
 // Goal: nothing is written into what only stands in a new container's place. Method: another user's directory there,
-// with no record of the daemon's, with one that its owner made, with a link; and the container itself.
+// with no record of the daemon's, with one that its owner made, with a link; file systems that never answer, mounted on
+// the way; and the container itself.
 TEST(Content, AnotherDirectoryInTheContainersPlace) {
     if (::geteuid() != 0)
         GTEST_SKIP() << "only root can make another user's directory";
     const World world;
-    EXPECT_TRUE(openContainer(world.path("/container")));
+    const auto open = [](const std::string& path) { return openNewContainer(path, MountFence::Kind::home); };
+    const std::string place = world.path("/home/Containers");
+    const std::string application = place + "/Data/Application";
+    std::filesystem::create_directories(application);
+    const std::string container = application + "/new";
+    ASSERT_EQ(::rename(world.path("/container").c_str(), container.c_str()), 0);
+    EXPECT_TRUE(open(container));
     for (const bool forged : {false, true}) {
-        const std::string other = world.path(forged ? "/forged" : "/other");
+        const std::string other = application + (forged ? "/forged" : "/other");
         ::mkdir(other.c_str(), 0755);
         if (forged) {
             writeFile(other + "/" + metadata, "whose it is");
             ::chown((other + "/" + metadata).c_str(), ownerId + 1, ownerId + 1);
         }
         ::chown(other.c_str(), ownerId + 1, ownerId + 1);
-        EXPECT_FALSE(openContainer(other)) << other;
+        EXPECT_FALSE(open(other)) << other;
     }
-    ::symlink("container", world.path("/link").c_str());
-    EXPECT_FALSE(openContainer(world.path("/link")));
+    ::symlink("new", (application + "/link").c_str());
+    EXPECT_FALSE(open(application + "/link"));
+    for (const std::string& at : {container, application, place, world.path("/home")}) {
+        const zor::support::HangingFileSystem hanging(at, ownerId);
+        if (!hanging.mounted())
+            GTEST_SKIP() << "file systems of users (FUSE) cannot be mounted here";
+        const auto begin = std::chrono::steady_clock::now();
+        const auto opened = open(container);
+        EXPECT_LT(std::chrono::steady_clock::now() - begin, 2 * zor::fs::homePatience) << at;
+        ASSERT_FALSE(opened) << at;
+        EXPECT_NE(opened.error().what.find("unmount"), std::string::npos) << opened.error().what;
+    }
 }
 
 // Goal: what another program of root's keeps closed in the container does not come out of it. Method: its directory is

@@ -113,4 +113,26 @@ TEST(UserMount, KeepsNobodyWaiting) {
     }
 }
 
+// Goal: a request that waits for ever, for a file system that only the system mounts, does not keep the daemon from
+// ending. Method: a mount whose server is silent in the place of a class of the system's, and a request for it.
+TEST(SystemMount, KeepsNoEndWaiting) {
+    DaemonProcess daemon;
+    daemon.start();
+    auto system = dataContainer("app");
+    system.containerClass = 12; // Data/System
+    system.user = 499;
+    ASSERT_TRUE(daemon.client().createOrLookup(system));
+    const support::HangingFileSystem hanging(daemon.path("private/var/containers/Data/System"), 0);
+    if (!hanging.mounted())
+        GTEST_SKIP() << "file systems of users (FUSE) cannot be mounted here";
+    std::thread request([&] {
+        auto client = daemon.client();
+        system.identifier = "another";
+        EXPECT_FALSE(client.createOrLookup(system));
+    });
+    std::this_thread::sleep_for(std::chrono::milliseconds(200)); // it waits
+    EXPECT_LT(secondsOf([&] { EXPECT_EQ(daemon.terminate(), 0); }), 15);
+    request.join();
+}
+
 } // namespace zor::whole

@@ -135,7 +135,7 @@ int Installation::install(Client& client) {
               .user = userOf(target_),
               .identifier = target_.identifier,
               .uuid = made->uuid};
-    const auto container = content::openContainer(freshPath_);
+    const auto container = content::openNewContainer(freshPath_, fenceKind(target_.containerClass));
     if (!container)
         return failed(container.error().what);
     {

@@ -1,6 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "KnownContainer.h"
 
+#include "base/ContainerClass.h"
+
 #include <algorithm>
 
 namespace zorvanectl {
@@ -24,6 +26,12 @@ zorvane::Result<zorvane::Client::Address> find(zorvane::Client& client, const Ta
                                     .user = userOf(target),
                                     .identifier = target.identifier,
                                     .uuid = found->uuid};
+}
+
+content::MountFence::Kind fenceKind(std::uint64_t containerClass) {
+    return zor::isPerUserClass(static_cast<zor::ContainerClass>(containerClass))
+               ? content::MountFence::Kind::home
+               : content::MountFence::Kind::systemPlace;
 }
 
 std::optional<std::uint64_t> measured(const zorvane::ConnectOptions& connect,

@@ -3,6 +3,7 @@
 #pragma once
 
 #include "Commands.h"
+#include "content/ContainerDirectory.h"
 
 #include <span>
 
@@ -16,6 +17,9 @@ inline constexpr std::uint64_t codeNotFound = 21;
 /// The address of a container. Asking for it otherwise would discard a transient one.
 [[nodiscard]] zorvane::Result<zorvane::Client::Address> find(zorvane::Client& client, const Target& target,
                                                              bool transient);
+
+/// How the directory of such a container is to be opened.
+[[nodiscard]] content::MountFence::Kind fenceKind(std::uint64_t containerClass);
 
 /// Bytes that containers take together; nothing when that cannot be told. On a connection of its own: one whose time
 /// ran out over it would be of no more use for what follows.

@@ -25,7 +25,6 @@ namespace names = zor::platform::names;
 using zor::platform::defaultProtectionClass;
 using zor::platform::FileDescriptor;
 using zor::platform::FileDeviceLockState;
-using zor::platform::openBeneath;
 using zor::platform::SystemRoot;
 using zor::platform::XattrProtectionClass;
 
@@ -47,17 +46,16 @@ std::string classOnDisk(int directory) {
 }
 
 /// Of each directory that lies in the container.
-std::map<std::string, std::string> classesOnDisk(const std::string& path) {
-    std::map<std::string, std::string> classes;
-    const FileDescriptor root(::open("/", O_PATH | O_DIRECTORY | O_CLOEXEC));
-    auto container = openBeneath(root.get(), path.c_str() + 1, O_RDONLY | O_DIRECTORY);
+content::Outcome<std::map<std::string, std::string>> classesOnDisk(const std::string& path, std::uint64_t kind) {
+    auto container = content::openToldContainer(path, fenceKind(kind));
     if (!container)
-        return classes;
+        return std::unexpected(container.error());
+    std::map<std::string, std::string> classes;
     const int fd = container->release();
     const std::unique_ptr<DIR, int (*)(DIR*)> entries(::fdopendir(fd), ::closedir);
     if (!entries) {
         ::close(fd);
-        return classes;
+        return content::failed("the container " + printable(path) + " cannot be read", ENOMEM);
     }
     while (const dirent* entry = ::readdir(entries.get())) {
         if (entry->d_name[0] == '.')
@@ -164,11 +162,14 @@ int protection(const zorvane::ConnectOptions& connect, const Output& output, con
             const auto metadata = client.metadata(address);
             if (!metadata)
                 return output.error(metadata.error(), what);
+            const auto onDisk = classesOnDisk(metadata->path, target.containerClass);
+            if (!onDisk)
+                return output.localError(exitLocalError, onDisk.error().what, "try again when the cause is gone", what);
             const auto found = metadata->info.find(std::string(zorvane::protectionClassInfoKey()));
             const auto* number =
                 found == metadata->info.end() ? nullptr : std::get_if<std::int64_t>(&found->second.content);
-            return showProtection(output, address, number ? *number : defaultProtectionClass,
-                                  classesOnDisk(metadata->path), pendingChange(connect, address));
+            return showProtection(output, address, number ? *number : defaultProtectionClass, *onDisk,
+                                  pendingChange(connect, address));
         });
 }
 
