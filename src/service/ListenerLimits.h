@@ -56,7 +56,8 @@ struct ListenerLimits {
     unsigned threadsMaxPerUser = 16;
     /// Threads in all, those included that wait inside a handler: each user's share, and one more for the owners of the
     /// root and the system's own users, so that all other users together leave them that.
-    unsigned threadsMax = threadsMaxPerUser * (lastMobileUserId - firstMobileUserId + 1 + strangers) + threadsMaxPerUser;
+    unsigned threadsMax =
+        threadsMaxPerUser * (lastMobileUserId - firstMobileUserId + 1 + strangers) + threadsMaxPerUser;
     /// A thread that is not needed ends after this time.
     std::chrono::milliseconds threadIdle{5000};
     /// How long a handler may wait unannounced before another thread takes its place.
