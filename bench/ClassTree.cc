@@ -5,7 +5,7 @@
 #include "Processes.h"
 #include "Report.h"
 #include "Statistics.h"
-#include "fs/MetadataFileName.h"
+#include "fs/Names.h"
 #include "plist/Binary.h"
 #include "store/ZORMetadata.h"
 

@@ -2,7 +2,7 @@
 // How names are shown.
 #include "zorvane/Text.h"
 
-#include "plist/EscapedText.h"
+#include "plist/Text.h"
 
 namespace zorvane {
 

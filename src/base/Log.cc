@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "base/Log.h"
 
-#include "plist/EscapedText.h"
+#include "plist/Text.h"
 
 namespace zor {
 

@@ -6,7 +6,7 @@
 #include "base/Mutex.h"
 #include "base/Result.h"
 #include "base/UserNumbers.h"
-#include "platform/Queries.h"
+#include "platform/Device.h"
 
 #include <atomic>
 #include <cstdint>

@@ -7,8 +7,7 @@
 #pragma once
 
 #include "base/Result.h"
-#include "platform/CrashAnnotation.h"
-#include "platform/Queries.h"
+#include "platform/Device.h"
 
 #include <exception>
 #include <string>

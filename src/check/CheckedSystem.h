@@ -1,25 +1,56 @@
 // SPDX-License-Identifier: Apache-2.0
-// What a check looks at: a system root, and the daemon's own readers over it, on a disk that refuses every change.
-//
-// Opening it makes nothing, takes no lock and asks no daemon. One thread.
+// The system that a check looks at, on a disk that refuses every change.
 #pragma once
 
 #include "base/Log.h"
-#include "check/ReadOnlyDisk.h"
 #include "device/FileDeviceLockState.h"
 #include "device/SemaphoreBootMarker.h"
 #include "device/XattrProtectionClass.h"
 #include "fs/ZORFileManager.h"
 #include "identity/LinuxPasswordDatabase.h"
+#include "os/Openat2.h"
 #include "os/SystemRoot.h"
+#include "platform/Disk.h"
 #include "platform/PlatformLog.h"
 #include "store/StorePlaces.h"
 
+#include <cerrno>
 #include <expected>
 #include <memory>
 #include <string>
 
 namespace zor::check {
+
+// A disk that cannot be changed: every call that would fails with EROFS, whatever a reader that shares code with the
+// daemon does.
+
+class ReadOnlyDisk final : public platform::Disk {
+public:
+    int makeDirectory(int, const char*, mode_t) override { return -EROFS; }
+    int createFile(int, const char*, mode_t) override { return -EROFS; }
+    int makeSymbolicLink(const char*, int, const char*) override { return -EROFS; }
+    int makeHardLink(int, const char*, int, const char*) override { return -EROFS; }
+    int makeFifo(int, const char*, mode_t) override { return -EROFS; }
+    int rename(int, const char*, int, const char*, unsigned) override { return -EROFS; }
+    int unlinkFile(int, const char*) override { return -EROFS; }
+    int removeDirectory(int, const char*) override { return -EROFS; }
+    int changeMode(int, mode_t) override { return -EROFS; }
+    int changeOwner(int, uid_t, gid_t) override { return -EROFS; }
+    int setTimes(int, const timespec&, const timespec&) override { return -EROFS; }
+    int setAttribute(int, const char*, std::span<const std::uint8_t>) override { return -EROFS; }
+    int setInodeFlags(int, int) override { return -EROFS; }
+    int write(int, std::span<const std::uint8_t>) override { return -EROFS; }
+    int cloneData(int, int) override { return -EROFS; }
+    ssize_t copyData(int, int, std::size_t) override { return -EROFS; }
+    int sync(int) override { return -EROFS; }
+    int syncFileSystem(int) override { return -EROFS; }
+    int orderData(int) override { return -EROFS; }
+    [[nodiscard]] bool hidesNames(int directory) override { return platform::hidesNames(directory); }
+};
+
+// What a check looks at: a system root, and the daemon's own readers over it, on a disk that refuses every change.
+//
+// Opening it makes nothing, takes no lock and asks no daemon. One thread.
 
 /// Readers say in the log what they cannot read; here the findings say it.
 class SilentLog final : public platform::PlatformLog {

@@ -5,7 +5,7 @@
 #include "check/ShellText.h"
 #include "fs/AtomicFile.h"
 #include "fs/ItemStatus.h"
-#include "fs/LeftoverNames.h"
+#include "fs/Names.h"
 #include "ipc/Keys.h"
 #include "os/Names.h"
 #include "os/Openat2.h"

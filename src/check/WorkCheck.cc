@@ -1,13 +1,13 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "check/WorkCheck.h"
 
-#include "base/PercentEncoding.h"
-#include "device/SandboxLinks.h"
+#include "base/Format.h"
+#include "device/LinkSandboxUserState.h"
 #include "fs/AtomicFile.h"
 #include "fs/FileSystemDeathRow.h"
-#include "fs/LeftoverNames.h"
-#include "os/DirectoryNames.h"
+#include "fs/Names.h"
 #include "os/Names.h"
+#include "os/Openat2.h"
 #include "store/ReplaceJournal.h"
 
 #include <ctime>

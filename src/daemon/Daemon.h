@@ -7,7 +7,7 @@
 #pragma once
 
 #include "daemon/Composition.h"
-#include "platform/ServiceTransaction.h"
+#include "platform/RunLoop.h"
 
 #include <cstddef>
 #include <functional>

@@ -5,10 +5,10 @@
 #include "daemon/LinuxPlatform.h"
 #include "daemon/Options.h"
 #include "daemon/Status.h"
+#include "os/EpollRunLoop.h"
+#include "os/FileDescriptor.h"
 #include "os/Names.h"
 #include "os/NotifySocket.h"
-#include "os/SignalDescriptor.h"
-#include "os/StandardDescriptors.h"
 #include "service/StatusSocket.h"
 
 #include <atomic>

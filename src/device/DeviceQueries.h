@@ -3,7 +3,7 @@
 #pragma once
 
 #include "os/SystemRoot.h"
-#include "platform/Queries.h"
+#include "platform/Device.h"
 
 namespace zor::platform {
 

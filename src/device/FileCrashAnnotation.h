@@ -4,7 +4,7 @@
 #pragma once
 
 #include "os/SystemRoot.h"
-#include "platform/CrashAnnotation.h"
+#include "platform/Device.h"
 #include "platform/Disk.h"
 
 namespace zor::platform {

@@ -5,7 +5,6 @@
 #include "os/Inotify.h"
 #include "os/Names.h"
 #include "os/Openat2.h"
-#include "os/SmallFile.h"
 
 #include <cerrno>
 #include <charconv>

@@ -12,7 +12,7 @@
 #include "base/Mutex.h"
 #include "os/FileDescriptor.h"
 #include "os/SystemRoot.h"
-#include "platform/DeviceLockState.h"
+#include "platform/Device.h"
 
 #include <optional>
 #include <sys/stat.h>

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "device/FileTerminationAssertionService.h"
 
-#include "base/PercentEncoding.h"
+#include "base/Format.h"
 #include "os/Names.h"
 #include "os/Openat2.h"
 

@@ -11,8 +11,8 @@
 #include "base/Mutex.h"
 #include "os/FileDescriptor.h"
 #include "os/SystemRoot.h"
+#include "platform/Device.h"
 #include "platform/Disk.h"
-#include "platform/TerminationAssertionService.h"
 
 #include <expected>
 #include <map>

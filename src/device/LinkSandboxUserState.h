@@ -1,20 +1,48 @@
 // SPDX-License-Identifier: Apache-2.0
+// Sandbox mappings as links below the runtime directory: reading them, and the role that keeps them.
+#pragma once
+
+#include "os/FileDescriptor.h"
+#include "os/SystemRoot.h"
+#include "platform/Device.h"
+#include "platform/Disk.h"
+
+#include <atomic>
+#include <cstdint>
+#include <expected>
+#include <functional>
+#include <optional>
+#include <string>
+
+namespace zor::platform {
+
+// Reading sandbox mappings as they lie on the disk; who sets them is LinkSandboxUserState. Changes nothing. Any thread.
+
+struct SandboxDirectory {
+    /// A real descriptor, open during the call only.
+    int descriptor = -1;
+    /// Names of directories: numbers, unless somebody else made them.
+    std::string user;
+    std::string itemType;
+    /// nullopt where the name is no number.
+    [[nodiscard]] std::optional<std::uint32_t> userId() const;
+};
+/// Calls `found` for each directory of mappings. Nothing when there are none; what is no directory is passed over.
+void forEachSandboxDirectory(const SystemRoot& root, const std::function<void(const SandboxDirectory&)>& found);
+
+/// Whether a name is what a stop in the middle of a replacement left.
+[[nodiscard]] inline bool isSandboxLeftover(const std::string& name) {
+    return name.starts_with('.');
+}
+/// Whether the link leads to nothing, as `isGone` says of a path inside the root, or out of the root.
+[[nodiscard]] bool isDanglingSandboxLink(const SystemRoot& root, int directory, const char* name,
+                                         const std::function<bool(const std::string& path)>& isGone);
+
 // Sandbox mappings as symbolic links: run/zorvane/sandbox/<uid>/<item type>/<identifier, percent-encoded> points to the
 // container. Whoever builds a sandbox reads them.
 //
 // A mapping is replaced by rename: a reader sees the old or the new one. A failure in the middle leaves a hidden name,
 // which the next launch removes. The directory is root's and ends with the boot, so nothing is synced.
-#pragma once
-
-#include "os/FileDescriptor.h"
-#include "os/SystemRoot.h"
-#include "platform/Disk.h"
-#include "platform/SandboxUserState.h"
-
-#include <atomic>
-#include <expected>
-
-namespace zor::platform {
 
 class LinkSandboxUserState final : public SandboxUserState {
 public:

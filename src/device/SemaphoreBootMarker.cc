@@ -3,7 +3,6 @@
 
 #include "os/Names.h"
 #include "os/Openat2.h"
-#include "os/SmallFile.h"
 
 #include <cerrno>
 #include <cinttypes>

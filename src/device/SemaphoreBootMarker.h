@@ -10,7 +10,7 @@
 #pragma once
 
 #include "os/SystemRoot.h"
-#include "platform/BootMarker.h"
+#include "platform/Device.h"
 
 namespace zor::platform {
 

@@ -6,9 +6,8 @@
 // (1 and 2). Any thread.
 #pragma once
 
-#include "platform/DeviceLockState.h"
+#include "platform/Device.h"
 #include "platform/Disk.h"
-#include "platform/FileProtectionClass.h"
 
 #include <atomic>
 #include <optional>

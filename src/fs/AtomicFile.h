@@ -1,22 +1,28 @@
 // SPDX-License-Identifier: Apache-2.0
-// Replacing a file in one step: the old content or the new one, whole, whenever somebody looks or the power goes.
-//
-// A temporary file (its name begins with ".") in the same directory is written and synced, renamed over the target, and
-// the directory is synced. A stop before the rename leaves the temporary file, which no listing shows; the next write
-// of the same target removes it. Any thread; writers of one target are serialised by their
-// callers.
+// Small files: replaced in one step, and read where others may write.
 #pragma once
 
 #include "platform/Disk.h"
+#include "plist/Value.h"
 
+#include <cstddef>
 #include <cstdint>
+#include <expected>
 #include <functional>
+#include <optional>
 #include <span>
 #include <string>
 #include <string_view>
 #include <sys/types.h>
 
 namespace zor::fs {
+
+// Replacing a file in one step: the old content or the new one, whole, whenever somebody looks or the power goes.
+//
+// A temporary file (its name begins with ".") in the same directory is written and synced, renamed over the target, and
+// the directory is synced. A stop before the rename leaves the temporary file, which no listing shows; the next write
+// of the same target removes it. Any thread; writers of one target are serialised by their
+// callers.
 
 /// 0, or a negative errno with the target untouched (unless only the last directory sync failed).
 /// `mode` is set whatever the process's mask; the file belongs to the daemon. `prepare` does more to the new file
@@ -35,5 +41,18 @@ namespace zor::fs {
 
 /// `prefix` and six random characters.
 [[nodiscard]] std::string uniqueName(std::string prefix);
+
+// Reading small files that lie where others may write: only what the daemon itself can have written is believed.
+
+/// Largest file of one container: its info values have to fit.
+inline constexpr std::size_t metadataFileBytesMax = std::size_t{1} << 20;
+
+/// The whole of a file, or an errno. `path` is relative to `directory` and resolved without following a link.
+///
+/// The file must be regular, have one link, belong to root or the daemon's user (or to `formerOwner`, for files of an
+/// older system), not be writable by group or others, and hold at most `bytesMax`; else EPERM or EFBIG. Opening cannot
+/// block, whatever is found there. Any thread.
+[[nodiscard]] std::expected<plist::Data, int> readOwnedFile(int directory, const char* path, std::size_t bytesMax,
+                                                            std::optional<uid_t> formerOwner = std::nullopt);
 
 } // namespace zor::fs

@@ -2,7 +2,6 @@
 #include "fs/DictionaryFile.h"
 
 #include "fs/AtomicFile.h"
-#include "fs/OwnedFile.h"
 #include "os/Openat2.h"
 #include "plist/Binary.h"
 #include "plist/Read.h"

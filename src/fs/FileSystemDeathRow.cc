@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/FileSystemDeathRow.h"
 
-#include "fs/LeftoverNames.h"
+#include "fs/Names.h"
 #include "os/Openat2.h"
 
 #include <cerrno>

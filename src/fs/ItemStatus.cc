@@ -1,10 +1,15 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/ItemStatus.h"
 
+#include "fs/BulkDirectoryRead.h"
+
+#include <array>
 #include <cerrno>
 #include <cstring>
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <sys/sysmacros.h>
+#include <unistd.h>
 
 namespace zor::fs {
 
@@ -63,6 +68,15 @@ std::uint64_t mountNumber(int descriptor) {
     if (::statx(descriptor, "", AT_EMPTY_PATH | remembered, STATX_MNT_ID, &found) != 0)
         return 0;
     return found.stx_mnt_id;
+}
+
+bool isFreshDirectory(int directory) {
+    struct stat status{};
+    if (::fstat(directory, &status) != 0 || status.st_uid != ::geteuid() || (status.st_mode & 077) != 0)
+        return false;
+    std::array<std::byte, 1024> buffer;
+    BulkDirectoryRead entries(directory, buffer);
+    return entries.seek(0) == 0 && entries.next() == nullptr && entries.error() == 0;
 }
 
 } // namespace zor::fs

@@ -24,4 +24,9 @@ struct MountIdentity {
 /// The number of the mount in /proc/self/mountinfo; 0 when it cannot be had.
 [[nodiscard]] std::uint64_t mountNumber(int descriptor);
 
+// A directory that was made where others may write: they can put another in its place before it is opened.
+
+/// Whether the open directory can be the one that this process just made: its own, closed to others, and empty.
+[[nodiscard]] bool isFreshDirectory(int directory);
+
 } // namespace zor::fs

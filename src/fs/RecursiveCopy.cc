@@ -4,9 +4,8 @@
 // nothing has to be kept in memory. It goes before the root gets its attributes.
 #include "fs/RecursiveCopy.h"
 
-#include "fs/CopyAttributes.h"
-#include "fs/CopyData.h"
-#include "fs/FreshDirectory.h"
+#include "fs/CopyItem.h"
+#include "fs/ItemStatus.h"
 #include "fs/RecursiveRemove.h"
 #include "fs/TreeWalker.h"
 #include "os/Openat2.h"

@@ -3,7 +3,6 @@
 #include "fs/ZORFileManager.h"
 
 #include "fs/AtomicFile.h"
-#include "fs/FreshDirectory.h"
 #include "fs/Hidden.h"
 #include "fs/ItemStatus.h"
 #include "os/Openat2.h"

@@ -17,8 +17,8 @@
 #include "fs/DiskUsage.h"
 #include "fs/PathResolver.h"
 #include "fs/TreeWalker.h"
+#include "platform/Device.h"
 #include "platform/Disk.h"
-#include "platform/FileProtectionClass.h"
 #include "plist/Value.h"
 
 #include <atomic>

@@ -5,11 +5,10 @@
 #include "fs/DiskUsage.h"
 #include "fs/Hidden.h"
 #include "fs/ItemStatus.h"
-#include "fs/LeftoverNames.h"
-#include "fs/MetadataFileName.h"
-#include "fs/NamesMet.h"
+#include "fs/Names.h"
 #include "fs/RecursiveCopy.h"
 #include "fs/RecursiveRemove.h"
+#include "fs/TreeWalker.h"
 #include "fs/ZORFileManager.h"
 #include "os/Openat2.h"
 

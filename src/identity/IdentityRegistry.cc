@@ -4,7 +4,7 @@
 #include "base/Format.h"
 #include "os/CoarseClock.h"
 #include "os/Names.h"
-#include "plist/Unite.h"
+#include "plist/Value.h"
 
 #include <algorithm>
 #include <fcntl.h>

@@ -4,7 +4,7 @@
 #pragma once
 
 #include "os/SystemRoot.h"
-#include "platform/Queries.h"
+#include "platform/Device.h"
 
 #include <functional>
 #include <pwd.h>

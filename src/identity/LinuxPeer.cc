@@ -4,7 +4,7 @@
 #include "base/Shortage.h"
 #include "identity/CgroupUnit.h"
 #include "os/CoarseClock.h"
-#include "os/SmallFile.h"
+#include "os/Openat2.h"
 
 #include <cerrno>
 #include <climits>

@@ -3,7 +3,7 @@
 
 #include "base/Shortage.h"
 #include "identity/LinuxPeer.h"
-#include "os/SmallFile.h"
+#include "os/Openat2.h"
 
 #include <cerrno>
 #include <charconv>

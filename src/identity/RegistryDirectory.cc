@@ -2,10 +2,8 @@
 #include "identity/RegistryDirectory.h"
 
 #include "base/Shortage.h"
-#include "os/DirectoryNames.h"
 #include "os/Names.h"
 #include "os/Openat2.h"
-#include "os/SmallFile.h"
 
 #include <cerrno>
 #include <cstring>

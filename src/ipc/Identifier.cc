@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "ipc/Identifier.h"
 
-#include "plist/Utf8.h"
+#include "plist/Text.h"
 
 namespace zor::ipc {
 

@@ -3,7 +3,6 @@
 
 #include "fs/AtomicFile.h"
 #include "fs/DictionaryFile.h"
-#include "fs/OwnedFile.h"
 #include "os/Openat2.h"
 #include "plist/Binary.h"
 #include "store/Names.h"

@@ -7,7 +7,7 @@
 #include "operations/ZORClientConnection.h"
 #include "operations/ZORContainerMigrator.h"
 #include "operations/ZOREntitlementMapping.h"
-#include "plist/Unite.h"
+#include "plist/Value.h"
 #include "store/Names.h"
 
 #include <array>

@@ -4,7 +4,7 @@
 // A change is one atomic replacement of the metadata file: a stop leaves the old file or the new one.
 #include "operations/StoreServices.h"
 #include "operations/ZORClientConnection.h"
-#include "plist/HeldBytes.h"
+#include "plist/Value.h"
 
 #include <cerrno>
 #include <optional>

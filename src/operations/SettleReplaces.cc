@@ -6,7 +6,7 @@
 //
 // A try is the launch's own recovery of that journal, so it leaves what that leaves (`ReplaceRecovery.cc`). It syncs
 // under the lock where the file system keeps no order: that is rare, and nobody may act on half of it.
-#include "fs/OwnedFile.h"
+#include "fs/AtomicFile.h"
 #include "operations/StoreServices.h"
 #include "operations/ZORClientConnection.h"
 #include "store/ContainerLayout.h"

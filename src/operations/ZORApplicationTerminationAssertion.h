@@ -6,7 +6,7 @@
 #pragma once
 
 #include "base/Log.h"
-#include "platform/TerminationAssertionService.h"
+#include "platform/Device.h"
 
 #include <cstdint>
 #include <memory>

@@ -12,7 +12,7 @@
 #include "base/ContainerClass.h"
 #include "base/FileURL.h"
 #include "base/Result.h"
-#include "platform/Queries.h"
+#include "platform/Device.h"
 
 #include <cstdint>
 #include <memory>

@@ -15,7 +15,6 @@
 // Held by shared_ptr: a retry that waits on the lock-state queue keeps it. It runs on one thread at a time.
 #pragma once
 
-#include "fs/NamesMet.h"
 #include "fs/TreeWalker.h"
 #include "operations/ZORClientConnection.h"
 

@@ -13,6 +13,7 @@
 #include <atomic>
 #include <chrono>
 #include <cstdint>
+#include <initializer_list>
 #include <map>
 #include <memory>
 #include <optional>
@@ -62,6 +63,21 @@ private:
     std::map<unsigned, Timer> timers_ ZOR_GUARDED_BY(mutex_);
     unsigned lastTimer_ ZOR_GUARDED_BY(mutex_) = 0;
     std::vector<std::function<void()>> posted_ ZOR_GUARDED_BY(mutex_);
+};
+
+// Signals as something to read: blocks them in the calling thread, so in every thread started after, and hands them out
+// through a descriptor that a run loop can watch. To be made by main before any thread. Never unblocked.
+
+class SignalDescriptor {
+public:
+    explicit SignalDescriptor(std::initializer_list<int> signals);
+    /// -1 when the system gave none.
+    [[nodiscard]] int get() const { return descriptor_.get(); }
+    /// The next pending signal; nothing when there is none.
+    [[nodiscard]] std::optional<int> take();
+
+private:
+    FileDescriptor descriptor_;
 };
 
 } // namespace zor::platform

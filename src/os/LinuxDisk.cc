@@ -2,7 +2,7 @@
 #include "os/LinuxDisk.h"
 
 #include "base/BlockingScope.h"
-#include "os/HiddenNames.h"
+#include "os/Openat2.h"
 
 #include <cerrno>
 #include <cstdio>

@@ -1,10 +1,15 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "os/Openat2.h"
 
+#include "os/FileDescriptor.h"
+
+#include <algorithm>
 #include <cerrno>
 #include <cstdint>
+#include <dirent.h>
 #include <fcntl.h>
 #include <linux/openat2.h>
+#include <memory>
 #include <string_view>
 #include <sys/stat.h>
 #include <sys/syscall.h>
@@ -71,6 +76,78 @@ std::expected<std::uint64_t, int> mountIdOf(int fd) {
     if ((status.stx_mask & STATX_MNT_ID) == 0)
         return std::unexpected(ENOSYS);
     return status.stx_mnt_id;
+}
+
+std::expected<std::string, int> readSmallFile(int fd, std::size_t bytesMax) {
+    struct stat status{};
+    if (::fstat(fd, &status) != 0)
+        return std::unexpected(errno);
+    if (!S_ISREG(status.st_mode))
+        return std::unexpected(EINVAL);
+    // The size is a hint only: files of procfs say 0, and others may grow meanwhile.
+    constexpr std::size_t readBytesMin = 512;
+    std::string bytes;
+    std::size_t filled = 0;
+    for (;;) {
+        if (filled > bytesMax)
+            return std::unexpected(EFBIG);
+        if (filled == bytes.size()) {
+            const std::size_t hinted = std::max(static_cast<std::size_t>(status.st_size) + 1, readBytesMin);
+            bytes.resize(std::min(std::max(hinted, filled * 2), bytesMax + 1));
+        }
+        const ssize_t count = ::read(fd, bytes.data() + filled, bytes.size() - filled);
+        if (count < 0 && errno == EINTR)
+            continue;
+        if (count < 0)
+            return std::unexpected(errno);
+        if (count == 0)
+            break;
+        filled += static_cast<std::size_t>(count);
+    }
+    bytes.resize(filled);
+    return bytes;
+}
+
+namespace {
+struct DirectoryCloser {
+    void operator()(DIR* directory) const { ::closedir(directory); }
+};
+} // namespace
+
+std::expected<std::vector<std::string>, int> directoryNames(int directory) {
+    std::vector<std::string> names;
+    FileDescriptor own(::openat(directory, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    const std::unique_ptr<DIR, DirectoryCloser> stream(own.valid() ? ::fdopendir(own.get()) : nullptr);
+    if (!stream)
+        return std::unexpected(errno);
+    (void)own.release();
+    for (;;) {
+        errno = 0;
+        const dirent* const entry = ::readdir(stream.get());
+        if (!entry && errno != 0)
+            return std::unexpected(errno);
+        if (!entry)
+            break;
+        const std::string_view name = entry->d_name;
+        if (name != "." && name != "..")
+            names.emplace_back(name);
+    }
+    std::ranges::sort(names);
+    return names;
+}
+
+std::vector<std::string> directoryNamesIfAny(int directory) {
+    return directoryNames(directory).value_or(std::vector<std::string>());
+}
+
+bool hidesNames(int directory) {
+    struct statx status{};
+    if (::statx(directory, "", AT_EMPTY_PATH | AT_STATX_DONT_SYNC, 0, &status) != 0 ||
+        (status.stx_attributes & STATX_ATTR_ENCRYPTED) == 0)
+        return false;
+    // Only making something needs the key. A file without a name is gone when it is closed.
+    const auto unnamed = openBeneath(directory, ".", O_TMPFILE | O_RDWR, 0600);
+    return !unnamed && unnamed.error() == ENOKEY;
 }
 
 } // namespace zor::platform

@@ -1,15 +1,20 @@
 // SPDX-License-Identifier: Apache-2.0
-// Opening below a directory that others may write to: no link is followed and no step leads out, whatever the tree does
-// meanwhile. Any thread.
+// Opening beneath an open directory, and what is read or named there.
 #pragma once
 
 #include "os/FileDescriptor.h"
 
+#include <cstddef>
 #include <cstdint>
 #include <expected>
+#include <string>
 #include <sys/types.h>
+#include <vector>
 
 namespace zor::platform {
+
+// Opening below a directory that others may write to: no link is followed and no step leads out, whatever the tree does
+// meanwhile. Any thread.
 
 /// Opens `relativePath` below `directory` (RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS; O_CLOEXEC is
 /// added). A link anywhere gives ELOOP (with O_PATH | O_NOFOLLOW a link in the last place too), a step out EXDEV.
@@ -31,5 +36,25 @@ namespace zor::platform {
 
 /// The number of the mount that an open file lies on. Asks its file system nothing; errno on failure.
 [[nodiscard]] std::expected<std::uint64_t, int> mountIdOf(int fd);
+
+// Reading a file of bounded size whole. Any thread.
+
+/// Everything from the descriptor's offset on. EFBIG when that is more than `bytesMax`, EINVAL when it is no regular
+/// file.
+[[nodiscard]] std::expected<std::string, int> readSmallFile(int fd, std::size_t bytesMax);
+
+// The names in a directory that only root writes to. Any thread.
+
+/// All names but "." and "..", sorted by their bytes; `directory` is a real descriptor, its offset is not used. An
+/// errno when not all could be read.
+[[nodiscard]] std::expected<std::vector<std::string>, int> directoryNames(int directory);
+/// The same for who can do without: none when it cannot be read.
+[[nodiscard]] std::vector<std::string> directoryNamesIfAny(int directory);
+
+// Whether a directory shows what is in it. One that is encrypted by its file system, while its key is away, does not:
+// it lists names that are none, and a name that is there is answered as missing. Any thread.
+
+/// False also where that cannot be told. `directory` is open, O_PATH will do.
+[[nodiscard]] bool hidesNames(int directory);
 
 } // namespace zor::platform

@@ -3,21 +3,12 @@
 // its own over a temporary root, or hands in a disk that fails.
 #pragma once
 
-#include "platform/BootMarker.h"
-#include "platform/CrashAnnotation.h"
-#include "platform/DeviceLockState.h"
+#include "platform/Device.h"
 #include "platform/Disk.h"
-#include "platform/FileProtectionClass.h"
 #include "platform/PeerIdentity.h"
 #include "platform/PlatformLog.h"
-#include "platform/Queries.h"
 #include "platform/RunLoop.h"
-#include "platform/SandboxUserState.h"
 #include "platform/ServiceListener.h"
-#include "platform/ServiceTransaction.h"
-#include "platform/TerminationAssertionService.h"
-#include "platform/UpcallPort.h"
-#include "platform/WorkQueue.h"
 
 namespace zor::platform {
 

@@ -19,7 +19,7 @@ public:
     /// Sends lines to a file from now on. When a line would pass `fileBytesMax`, file is renamed to file.1, file.1 to
     /// file.2 and so on, `fileCount` files in all; with one file it is started anew.
     virtual void enableDiskLogging(const std::string& path, unsigned fileCount, std::size_t fileBytesMax) = 0;
-    /// One event, one line: what steers or is not seen is escaped, but for tabs (plist/EscapedText.h). Any thread.
+    /// One event, one line: what steers or is not seen is escaped, but for tabs (plist/Text.h). Any thread.
     virtual void write(int level, std::string_view function, std::string_view message) = 0;
     /// The system's own log (syslog), for what happens before there is a handle.
     virtual void writeToSystemLog(int priority, std::string_view message) = 0;

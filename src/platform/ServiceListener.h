@@ -1,15 +1,23 @@
 // SPDX-License-Identifier: Apache-2.0
-// The named service: connections, frames, replies. What a message means is the handler's business.
+// The two ways in: requests of clients, and upcalls of the kernel.
 #pragma once
 
 #include "platform/PeerIdentity.h"
+#include "platform/RunLoop.h"
 #include "plist/Value.h"
 
+#include <cstddef>
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <optional>
+#include <span>
+#include <string>
+#include <vector>
 
 namespace zor::platform {
+
+// The named service: connections, frames, replies. What a message means is the handler's business.
 
 /// Where the reply to one request goes. Copies share the destination; the first send counts. Any thread.
 class ReplyChannel {
@@ -55,6 +63,29 @@ public:
     virtual bool resume(ServiceHandler handler) = 0;
     /// Stops accepting, ends every connection and joins the threads.
     virtual void stop() = 0;
+};
+
+// The kernel's port: packets with the sender's credentials, and replies.
+
+struct UpcallPacket {
+    std::span<const std::uint8_t> bytes;
+    /// Absent when the kernel vouched for no credentials.
+    std::optional<pid_t> senderPid;
+    std::optional<uid_t> senderUserId;
+};
+
+class UpcallPort {
+public:
+    virtual ~UpcallPort() = default;
+    /// Binds the port under its service name. 0 or an errno; `checkInCallName` names the call that failed.
+    virtual int checkIn() = 0;
+    [[nodiscard]] virtual const char* checkInCallName() const = 0;
+    /// Serves packets on the loop: the handler returns the reply packet, empty for none. False when no source can be
+    /// made; `sourceCallName` then names the call.
+    virtual bool serve(RunLoop& loop, std::function<std::vector<std::uint8_t>(const UpcallPacket&)> handler) = 0;
+    [[nodiscard]] virtual const char* sourceCallName() const = 0;
+    /// The longest reply packet that the port can send; known once it is checked in. A longer one is dropped.
+    [[nodiscard]] virtual std::size_t replyBytesMax() const { return std::size_t{1} << 20; }
 };
 
 } // namespace zor::platform

@@ -4,8 +4,8 @@
 // often objects are shared. Containers being read are on a stack of at most nestingMax: meeting one again is a cycle.
 #include "plist/Binary.h"
 #include "plist/BinaryFormat.h"
-#include "plist/Limits.h"
-#include "plist/Utf8.h"
+#include "plist/Errors.h"
+#include "plist/Text.h"
 
 #include <algorithm>
 #include <array>

@@ -6,8 +6,8 @@
 // size.
 #include "plist/Binary.h"
 #include "plist/BinaryFormat.h"
-#include "plist/Limits.h"
-#include "plist/Utf8.h"
+#include "plist/Errors.h"
+#include "plist/Text.h"
 
 #include <algorithm>
 #include <bit>

@@ -1,9 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // The one-line form of a value. Its text often comes from clients, so nothing in it can end a log line or fill the log:
 // what must not be shown is escaped, and the work stops where the text is full.
-#include "plist/EscapedText.h"
-#include "plist/Limits.h"
-#include "plist/Utf8.h"
+#include "plist/Errors.h"
+#include "plist/Text.h"
 #include "plist/Value.h"
 
 #include <charconv>

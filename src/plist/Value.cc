@@ -5,6 +5,9 @@
 #include <cmath>
 #include <limits>
 #include <numeric>
+#include <optional>
+#include <set>
+#include <string>
 #include <utility>
 
 namespace zor::plist {
@@ -174,6 +177,67 @@ bool Value::operator==(const Value& other) const {
     if (const Date* date = asDate())
         return sameNumber(date->secondsSinceReference, other.asDate()->secondsSinceReference);
     return storage_ == other.storage_;
+}
+
+std::size_t heldBytes(const Dictionary& dictionary) {
+    std::size_t bytes = 0;
+    for (const auto& [key, value] : dictionary)
+        bytes += sizeof(std::string) + key.size() + heldBytes(value);
+    return bytes;
+}
+
+std::size_t heldBytes(const Value& value) {
+    std::size_t bytes = sizeof value;
+    if (const std::string* text = value.asString())
+        bytes += text->size();
+    else if (const Data* data = value.asData())
+        bytes += data->size();
+    else if (const Dictionary* dictionary = value.asDictionary())
+        bytes += heldBytes(*dictionary);
+    else if (const Array* array = value.asArray())
+        for (const Value& element : *array)
+            bytes += heldBytes(element);
+    return bytes;
+}
+
+namespace {
+
+/// A list, or a string as a list of one.
+std::optional<Array> listIn(const Value& value) {
+    if (const Array* array = value.asArray())
+        return *array;
+    return value.asString() ? std::optional(Array{value}) : std::nullopt;
+}
+
+Array unitedLists(Array first, const Array& second) {
+    std::set<std::string, std::less<>> present;
+    for (const Value& element : first)
+        if (const std::string* text = element.asString())
+            present.insert(*text);
+    for (const Value& element : second)
+        if (const std::string* text = element.asString(); text && present.insert(*text).second)
+            first.push_back(element);
+    return first;
+}
+
+} // namespace
+
+Dictionary united(Dictionary first, const Dictionary& second) {
+    for (const auto& [key, value] : second) {
+        const Value* const known = first.find(key);
+        if (!known) {
+            first.set(key, value);
+            continue;
+        }
+        if (*known == value)
+            continue;
+        const auto list = listIn(value);
+        if (auto knownList = listIn(*known))
+            first.set(key, unitedLists(std::move(*knownList), list.value_or(Array())));
+        else if (list || (known->asBoolean() && second.isTrue(key)))
+            first.set(key, value);
+    }
+    return first;
 }
 
 } // namespace zor::plist

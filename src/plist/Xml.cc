@@ -4,8 +4,8 @@
 // it has returned.
 #include "plist/Xml.h"
 
-#include "plist/Limits.h"
-#include "plist/Utf8.h"
+#include "plist/Errors.h"
+#include "plist/Text.h"
 #include "plist/XmlScalars.h"
 
 #include <algorithm>

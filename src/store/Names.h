@@ -3,7 +3,7 @@
 // too, in the header below) and nowhere else.
 #pragma once
 
-#include "fs/MetadataFileName.h"
+#include "fs/Names.h"
 
 #include <array>
 #include <string_view>

@@ -14,7 +14,7 @@
 #include "base/Mutex.h"
 #include "fs/BoundedQuestion.h"
 #include "fs/PathResolver.h"
-#include "platform/Queries.h"
+#include "platform/Device.h"
 
 #include <atomic>
 #include <cstdint>

@@ -4,7 +4,7 @@
 #include "base/BlockingScope.h"
 #include "base/UserIdentity.h"
 #include "fs/Hidden.h"
-#include "plist/HeldBytes.h"
+#include "plist/Value.h"
 #include "store/ClassDirectoryReader.h"
 #include "store/Names.h"
 

@@ -12,7 +12,7 @@
 #include "base/FileURL.h"
 #include "base/Mutex.h"
 #include "fs/ZORFileManager.h"
-#include "platform/Queries.h"
+#include "platform/Device.h"
 #include "store/StorePlaces.h"
 #include "store/UserHome.h"
 #include "store/ZORPerUserConfiguration.h"

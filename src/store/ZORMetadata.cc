@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ZORMetadata.h"
 
+#include "fs/AtomicFile.h"
 #include "fs/DictionaryFile.h"
 #include "fs/Hidden.h"
-#include "fs/OwnedFile.h"
 #include "ipc/Identifier.h"
 #include "ipc/Keys.h"
 #include "plist/Binary.h"

@@ -2,8 +2,8 @@
 #include "store/ZORWhitelist.h"
 
 #include "base/UUID.h"
+#include "fs/AtomicFile.h"
 #include "fs/DictionaryFile.h"
-#include "fs/OwnedFile.h"
 #include "os/Names.h"
 
 #include <algorithm>

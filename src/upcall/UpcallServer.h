@@ -10,7 +10,7 @@
 #pragma once
 
 #include "base/Result.h"
-#include "platform/UpcallPort.h"
+#include "platform/ServiceListener.h"
 #include "upcall/ProcessContainersReply.h"
 #include "upcall/ProcessContainersRequest.h"
 

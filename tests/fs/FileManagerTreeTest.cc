@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // The file manager's work on trees: listing, moving (across file systems too), removing, re-owning, reporting orphans.
 #include "fs/FileManagerWorld.h"
-#include "fs/MetadataFileName.h"
+#include "fs/Names.h"
 #include "fs/TreeWorld.h"
 
 #include <algorithm>

@@ -1,9 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/RefusalLimiter.h"
-#include "os/LogLine.h"
 #include "os/RotatingLog.h"
 #include "platform/TestRoot.h"
-#include "plist/EscapedText.h"
+#include "plist/Text.h"
 
 #include <csignal>
 #include <map>

@@ -1,7 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "os/EpollRunLoop.h"
 #include "os/SerialWorkQueue.h"
-#include "os/SignalDescriptor.h"
 #include "platform/TestRoot.h"
 
 #include <algorithm>

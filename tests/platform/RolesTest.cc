@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "base/PercentEncoding.h"
+#include "base/Format.h"
 #include "device/DeviceQueries.h"
 #include "device/FileCrashAnnotation.h"
 #include "device/FileDeviceLockState.h"

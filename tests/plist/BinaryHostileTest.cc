@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Bytes that want to crash the reader, keep it busy or fill the memory.
 #include "plist/Binary.h"
-#include "plist/Limits.h"
+#include "plist/Errors.h"
 #include "plist/Samples.h"
 #include "support/Allocations.h"
 

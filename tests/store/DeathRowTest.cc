@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // Death row: what gets there, on which file system, what a pass does with it, and the races between the two.
-#include "fs/LeftoverNames.h"
+#include "fs/Names.h"
 #include "world/World.h"
 
 #include <filesystem>

@@ -4,7 +4,7 @@
 #pragma once
 
 #include "os/FileDescriptor.h"
-#include "platform/UpcallPort.h"
+#include "platform/ServiceListener.h"
 #include "upcall/PackbuffWorld.h"
 #include "upcall/packbuff/Packbuff.h"
 #include "upcall/packbuff/UpcallMessage.h"

@@ -1,10 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Assertion.h"
 
-#include "base/PercentEncoding.h"
+#include "base/Format.h"
 #include "ipc/Names.h"
 #include "os/Openat2.h"
-#include "platform/TerminationAssertionService.h"
+#include "platform/Device.h"
 
 #include <cerrno>
 #include <charconv>

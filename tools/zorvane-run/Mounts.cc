@@ -2,7 +2,6 @@
 #include "Mounts.h"
 
 #include "fs/MountFences.h"
-#include "os/HiddenNames.h"
 #include "os/Openat2.h"
 
 #include <algorithm>

@@ -12,7 +12,7 @@
 #include "Registered.h"
 #include "Supervisor.h"
 #include "Upcall.h"
-#include "os/StandardDescriptors.h"
+#include "os/FileDescriptor.h"
 
 #include <algorithm>
 #include <csignal>

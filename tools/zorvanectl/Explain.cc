@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // What a code means and what to do about it. Asks nobody: it works without a daemon.
 #include "Commands.h"
-#include "check/FindingCode.h"
+#include "check/Finding.h"
 #include "zorvane/Error.h"
 
 #include <algorithm>

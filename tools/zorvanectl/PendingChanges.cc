@@ -2,7 +2,7 @@
 #include "PendingChanges.h"
 
 #include "Output.h"
-#include "platform/DeviceLockState.h"
+#include "platform/Device.h"
 
 namespace zorvanectl {
 

@@ -3,7 +3,7 @@
 // the public client library.
 #include "Commands.h"
 #include "Output.h"
-#include "os/StandardDescriptors.h"
+#include "os/FileDescriptor.h"
 
 #include <CLI/CLI.hpp>
 #include <algorithm>

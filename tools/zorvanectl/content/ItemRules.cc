@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "ItemRules.h"
 
-#include "fs/MetadataFileName.h"
+#include "fs/Names.h"
 #include "zorvane/Text.h"
 
 #include <algorithm>

@@ -2,7 +2,7 @@
 #include "SealedDirectory.h"
 
 #include "fs/BulkDirectoryRead.h"
-#include "fs/FreshDirectory.h"
+#include "fs/ItemStatus.h"
 #include "fs/RecursiveRemove.h"
 #include "os/Openat2.h"
 #include "zorvane/Text.h"

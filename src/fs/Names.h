@@ -1,11 +1,13 @@
 // SPDX-License-Identifier: Apache-2.0
-// Names that a stop may leave behind. None of them is ever taken for the real thing. What an atomic write leaves is
-// named in AtomicFile.h.
+// Names on disk that the file layer has to know.
 #pragma once
 
 #include <string_view>
 
 namespace zor::fs {
+
+// Names that a stop may leave behind. None of them is ever taken for the real thing. What an atomic write leaves is
+// named in AtomicFile.h.
 
 /// How a copy across file systems is named until it is whole.
 inline constexpr const char* copyPrefix = ".zorvaned-copy-";
@@ -26,3 +28,12 @@ inline constexpr const char* deathRowInner = "com.veltra.zorvaned.dead";
 }
 
 } // namespace zor::fs
+
+namespace zor::names {
+
+// The name of the hidden file in every container that says whom it belongs to. It has its home here because the file
+// manager leaves such files alone when it changes the owner of a tree; what is inside is the store's business.
+
+inline constexpr const char* metadataFile = ".com.veltra.zorvane.metadata.plist";
+
+} // namespace zor::names

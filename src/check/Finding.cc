@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "check/FindingCode.h"
+#include "check/Finding.h"
 
 #include <algorithm>
 #include <array>

@@ -1,6 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// UTF-8 as the readers, the writer and the descriptions need it. Strict: no overlong forms, no surrogates, nothing
-// above U+10FFFF. Pure functions.
+// UTF-8, and text of others made fit to be shown. Any thread.
 #pragma once
 
 #include <cstddef>
@@ -10,6 +9,9 @@
 #include <string_view>
 
 namespace zor::plist {
+
+// UTF-8 as the readers, the writer and the descriptions need it. Strict: no overlong forms, no surrogates, nothing
+// above U+10FFFF. Pure functions.
 
 /// One decoded character; `length` 0 means that the bytes at this place are no UTF-8.
 struct Utf8Character {
@@ -40,5 +42,19 @@ inline bool isAsciiWithoutNul(const char* bytes, std::size_t count) {
             return false;
     return true;
 }
+
+// Text that others chose, for logs and terminals: nothing in it ends a line, steers what shows it, turns the direction
+// in which it is read, or stays unseen.
+
+/// Whether a character may be shown as it is: no control character (a tab is one), none that turns the direction of
+/// writing, ends a line or is not seen. Every escaping of text asks here.
+[[nodiscard]] bool isShown(char32_t character);
+
+/// A tab steers no terminal, but it can move a column of a table, or stand for its end.
+enum class Tabs : std::uint8_t { stay, escaped };
+
+/// Appends `text`: newlines as \n; other control characters, characters that turn the direction of writing, end a line
+/// or are not seen, and bytes that are no UTF-8, as \xNN for each byte.
+void appendEscaped(std::string& line, std::string_view text, Tabs tabs = Tabs::stay);
 
 } // namespace zor::plist

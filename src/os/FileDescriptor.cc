@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "os/StandardDescriptors.h"
+#include "os/FileDescriptor.h"
 
 #include <fcntl.h>
 #include <initializer_list>
