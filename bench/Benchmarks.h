@@ -11,7 +11,7 @@ namespace zor::bench {
 
 /// One client asks for a container that is there: LookupBench.cc.
 std::vector<Figure> measureLookup(const Settings& settings);
-/// What entitlements cost a request: RegistrationBench.cc.
+/// The cost of entitlements to a request: RegistrationBench.cc.
 std::vector<Figure> measureRegistration(const Settings& settings);
 /// Many do: ThroughputBench.cc.
 std::vector<Figure> measureThroughput(const Settings& settings);
@@ -35,9 +35,9 @@ std::vector<Figure> measureBusy(const Settings& settings);
 std::vector<Figure> measureInstall(const Settings& settings);
 /// The first launch after a boot: BootBench.cc.
 std::vector<Figure> measureBoot(const Settings& settings);
-/// What the daemon costs when nobody asks, and until it answers: LifeBench.cc.
+/// The daemon's cost when nobody asks, and until it answers: LifeBench.cc.
 std::vector<Figure> measureStart(const Settings& settings);
-/// What it costs after it was asked very often: LifeBench.cc.
+/// Its cost after it was asked very often: LifeBench.cc.
 std::vector<Figure> measureEndurance(const Settings& settings);
 
 } // namespace zor::bench

@@ -107,7 +107,7 @@ std::vector<Figure> measureBusy(const Settings& settings) {
         removal.wait();
     }
     const std::vector<double> after = roundTrips(client, lookup, found, alone);
-    // What the machine does besides may spoil one of them, and must not make the goal an easy one.
+    // The machine's other work may spoil one of them, and must not make the goal an easy one.
     const double p99 = percentile(busy, 0.99);
     const double floorP99 = std::min(percentile(before, 0.99), percentile(after, 0.99));
     return {{.name = "busy.lookup",

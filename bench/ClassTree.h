@@ -16,7 +16,7 @@ public:
 
     [[nodiscard]] int count() const { return count_; }
     [[nodiscard]] static std::string identifier(int index);
-    /// What there is to know of one of them: directory name, internal UUID, identifier, user, class.
+    /// All there is to know of one of them: directory name, internal UUID, identifier, user, class.
     static constexpr std::size_t recordDataBytes = 16 + 16 + 31 + 4 + 1;
 
     /// The floor: opens, examines, reads and closes every metadata file, in the directory's order. Seconds that it

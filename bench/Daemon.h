@@ -14,7 +14,7 @@
 
 namespace zor::bench {
 
-/// What a run has: the programs, its place, and how long it may take.
+/// The means of a run: the programs, its place, and how long it may take.
 struct Settings {
     bool quick = false;
     std::string daemonProgram;

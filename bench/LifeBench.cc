@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the daemon costs while nobody asks, how soon it answers after its start, and whether many requests and
+// The daemon's cost while nobody asks, how soon it answers after its start, and whether many requests and
 // connections leave something behind.
 #include "Benchmarks.h"
 

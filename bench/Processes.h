@@ -13,7 +13,7 @@
 
 namespace zor::bench {
 
-/// What makes a measurement impossible; ends the run.
+/// A reason that makes a measurement impossible; ends the run.
 struct Failure : std::runtime_error {
     using std::runtime_error::runtime_error;
 };

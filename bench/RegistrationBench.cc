@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What it costs to keep entitlements up to date: registering what is registered already, and admitting a peer whose
+// The cost of keeping entitlements up to date: registering what is registered already, and admitting a peer whose
 // registration is its own. Both against a lookup in the same daemon, on one processor.
 #include "Benchmarks.h"
 #include "RoundTripPairs.h"

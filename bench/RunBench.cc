@@ -35,7 +35,7 @@ std::vector<std::string> launch(const std::string& launcher, const std::string& 
     return {launcher, "--root", root, "--identifier", identifier, "--user", std::to_string(userId), "--", program};
 }
 
-/// What a program writes to its standard output; a failure unless it ends well.
+/// A program's standard output; a failure unless it ends well.
 std::string outputOf(const std::vector<std::string>& command) {
     std::string line;
     for (const std::string& word : command)

@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
-// Where a run works: one directory beside the build, and in it file systems that were made for the run.
+// The place of a run's work: one directory beside the build, and in it file systems that were made for the run.
 //
 // Nothing of it may stay, however the run ends. Mounts are made in a mount namespace of the run's own, on loop devices
 // that let go of their image when they are unmounted, and the image loses its name at once: when the last process of
-// the run has ended, the kernel has cleaned up. What lies in the directory itself is removed by the process that
+// the run has ended, the kernel has cleaned up. The directory's own content is removed by the process that
 // watches over the run, or by the next run. One run at a time.
 #pragma once
 
@@ -50,7 +50,7 @@ public:
     Place& operator=(const Place&) = delete;
 
     [[nodiscard]] const std::string& path() const { return path_; }
-    /// What it is, for the report.
+    /// A description for the report.
     [[nodiscard]] const std::string& description() const { return description_; }
 
 private:

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What a figure is made of: percentiles of single samples, and ratios of blocks that were measured in turn.
+// The parts of a figure: percentiles of single samples, and ratios of blocks that were measured in turn.
 //
 // A machine is never quiet for long. So what is measured and its floor take turns in short blocks (A B A B …), each
 // pair of neighbours gives one ratio, and the median of these ratios is the figure: a disturbance spoils a pair, not

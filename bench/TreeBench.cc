@@ -13,7 +13,7 @@ namespace {
 constexpr ContainerClass containerClass = ContainerClass::dataApplication;
 /// A block; of one file in four, since to write all of them would take most of a run.
 constexpr std::size_t fileBytes = 1000;
-/// What a new container holds besides its content.
+/// The items of a new container besides its content.
 constexpr std::uint64_t bytesOfContainerMax = std::uint64_t{1} << 20;
 
 Container makeIn(const Daemon& daemon, const std::string& identifier) {

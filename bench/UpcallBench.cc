@@ -88,8 +88,8 @@ private:
     Frame buffer_;
 };
 
-/// What every server of such packets does: waits, receives one with its sender's credentials, looks whether each of the
-/// paths is there, sends the reply.
+/// The work of every server of such packets: it waits, receives one with its sender's credentials, looks whether each
+/// of the paths is there, sends the reply.
 class PacketEcho {
 public:
     PacketEcho(const std::string& directory, Frame reply, std::vector<std::string> paths, int processor)

@@ -174,7 +174,7 @@ int run(const Options& options) {
     for (const int signal : {SIGCHLD, SIGALRM, SIGINT, SIGTERM, SIGHUP})
         sigaddset(&signals, signal);
     ::sigprocmask(SIG_BLOCK, &signals, &before);
-    // What the measuring process leaves running becomes this one's to wait for.
+    // Everything that the measuring process leaves running becomes this one's to wait for.
     ::prctl(PR_SET_CHILD_SUBREAPER, 1);
     std::fflush(nullptr);
     const pid_t measuring = ::fork();

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
-// Any bytes as the stream of a client, cut anywhere. What the listener's input finds in them has to be what a reader
-// finds who has the whole stream before it: the same frames with the same bytes, or the same broken header at the same
-// place.
+// Any bytes as the stream of a client, cut anywhere. The frames that the listener's input finds in them have to be
+// those that a reader finds who has the whole stream before it: the same frames with the same bytes, or the same broken
+// header at the same place.
 //
 // The first byte chooses how the stream is cut, how many frames a turn may take, and whether nothing is served in the
 // turn in which it arrives (as when the peer leaves replies unread); the rest is the stream.
@@ -24,7 +24,7 @@ void mustHold(bool condition) {
         std::abort();
 }
 
-/// Where the next frame of the stream ends; 0 when it is not whole, or broken.
+/// The end of the stream's next frame; 0 when it is not whole, or broken.
 std::size_t wholeFrame(Bytes stream, bool& broken) {
     if (stream.size() < ipc::frameHeaderBytes)
         return 0;
@@ -104,7 +104,7 @@ private:
     Bytes rest_;
     const unsigned framesPerTurn_;
     const bool servesLater_;
-    /// What one receive can have touched.
+    /// The bytes that one receive can have touched.
     const std::size_t scratchUsed_;
 };
 

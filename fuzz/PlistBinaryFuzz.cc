@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// Any bytes as a binary property list. What reads has to be writable, and to read back as the same value and the same
-// bytes.
+// Any bytes as a binary property list. A value that reads has to be writable, and to read back as the same value and
+// the same bytes.
 #include "plist/Binary.h"
 
 #include <cstdlib>

@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// Any bytes as an XML property list. What reads has to be writable in the binary form and to read back from it equal.
+// Any bytes as an XML property list. A value that reads has to be writable in the binary form and to read back from it
+// equal.
 #include "plist/Binary.h"
 #include "plist/Xml.h"
 

@@ -67,8 +67,8 @@ private:
     mutable std::atomic<std::uint64_t> linesLost_{0};
 };
 
-/// What "%s" prints for an object: at most shownBytesMax bytes; an absent one is "(null)". Copies only what it must
-/// cut. Lives as long as the full expression it is written in.
+/// The text that "%s" prints for an object: at most shownBytesMax bytes; an absent one is "(null)". Copies only what it
+/// must cut. Lives as long as the full expression it is written in.
 class Shown {
 public:
     Shown(const char* text) : text_(text ? text : "(null)") {}

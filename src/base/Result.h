@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What an operation returns: a value or a ZORError. An operation logs an error or hands it on, as its description says.
+// The value of an operation, or its ZORError. An operation logs an error or hands it on, as its description says.
 #pragma once
 
 #include "base/ZORError.h"

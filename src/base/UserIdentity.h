@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// Whose containers a request may act on: the owner that each class demands, and what a client's own uid allows.
+// The users whose containers a request may act on: the owner that each class demands, and what a client's own uid
+// allows.
 #pragma once
 
 #include "base/ContainerClass.h"

@@ -14,7 +14,7 @@ inline constexpr std::uint32_t lastMobileUserId = 510;
 /// Stands for all users outside those numbers. No user has it: the kernel takes it for "no uid".
 inline constexpr std::uint32_t strangersUserId = UINT32_MAX;
 
-/// Under which number a user's shares and turns are counted. Whoever has a range of subordinate uids can connect as
+/// The number under which a user's shares and turns are counted. An owner of a range of subordinate uids can connect as
 /// each of them, so all that the system does not know are one.
 [[nodiscard]] constexpr std::uint32_t countedUserId(std::uint32_t userId) {
     return userId <= lastMobileUserId ? userId : strangersUserId;

@@ -14,7 +14,7 @@ namespace zor {
 
 enum class ErrorDomain : std::uint8_t { zor, posix };
 
-/// Where an error is made.
+/// The place at which an error is made.
 struct Here {
     const char* function;
     int line;
@@ -44,8 +44,8 @@ public:
     [[nodiscard]] bool isPosix(int number) const { return domain_ == ErrorDomain::posix && code_ == number; }
     /// Whether its POSIX number, or that of what caused it, is one of those.
     [[nodiscard]] bool isOwnShortage() const;
-    /// What a client gets as "ReplyError": the code, sign-extended from 32 bits. There 1 is success, so EPERM leaves as
-    /// EACCES.
+    /// The number that a client gets as "ReplyError": the code, sign-extended from 32 bits. There 1 is success, so
+    /// EPERM leaves as EACCES.
     [[nodiscard]] ErrorCode replyCode() const;
     /// For a line: domain, code and description, without the cause.
     [[nodiscard]] std::string text() const;

@@ -14,7 +14,7 @@ using platform::MutexLock;
 namespace {
 
 /// A lookup is done with the lock in a few microseconds, less than it takes to put a thread to sleep and to wake it.
-/// Who does not get the lock after that many turns waits for something slower.
+/// A thread that does not get the lock after that many turns waits for something slower.
 constexpr int yieldsMax = 16;
 
 const char* name(LockMode mode) {

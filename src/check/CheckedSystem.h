@@ -48,7 +48,8 @@ public:
     [[nodiscard]] bool hidesNames(int directory) override { return platform::hidesNames(directory); }
 };
 
-// What a check looks at: a system root, and the daemon's own readers over it, on a disk that refuses every change.
+// The things that a check looks at: a system root, and the daemon's own readers over it, on a disk that refuses every
+// change.
 //
 // Opening it makes nothing, takes no lock and asks no daemon. One thread.
 

@@ -55,7 +55,7 @@ std::string attributesText(mode_t mode, uid_t uid, gid_t gid, bool ownersCount) 
                        : formatted("mode %04o", static_cast<unsigned>(mode));
 }
 
-/// What is wrong with a directory's owner and mode, as the end of a sentence; empty when nothing is.
+/// The faults of a directory's owner and mode, as the end of a sentence; empty when there are none.
 std::string attributesFault(const struct stat& status, mode_t mode, std::uint32_t owner, bool ownersCount) {
     const bool rightOwner = !ownersCount || (status.st_uid == owner && status.st_gid == owner);
     const mode_t found = status.st_mode & ALLPERMS;
@@ -325,7 +325,7 @@ void ContainerCheck::checkInside(const Container& container) {
     for (const char* subdirectory : layout.subdirectories) {
         const std::string_view path = subdirectory;
         const std::size_t slash = path.rfind('/');
-        // What cannot be there for want of its parent is said once.
+        // A thing that cannot be there for want of its parent is said once.
         if (slash != path.npos && unusable.contains(path.substr(0, slash)))
             continue;
         if (!checkSubdirectory(container, layout, subdirectory))

@@ -45,7 +45,7 @@ enum class FindingCode : std::uint8_t {
 };
 inline constexpr std::size_t findingCodeCount = 25;
 
-/// Who puts it right.
+/// The one who puts it right.
 enum class Mender : std::uint8_t {
     /// It is no fault.
     nobody,
@@ -65,7 +65,7 @@ enum class Mender : std::uint8_t {
 /// Static strings, never empty.
 struct FindingPage {
     FindingCode code;
-    /// What programs know the finding by.
+    /// The word by which programs know the finding.
     std::string_view word;
     /// A note says what is as it should be but may surprise: a store with notes alone is whole.
     bool isNote;
@@ -95,10 +95,10 @@ struct Finding {
     bool transient = false;
     /// The container's identity, when its metadata was believed.
     std::optional<UUID> uuid;
-    /// Of metadata that is not valid: the rule that it breaks, a short word.
+    /// The rule that metadata breaks when it is not valid, a short word.
     std::string rule;
     Mender mender = Mender::person;
-    /// What a person may type; empty when nothing helps.
+    /// The command that a person may type; empty when nothing helps.
     std::string command;
 
     /// Whether two looks have seen the same.

@@ -114,7 +114,7 @@ std::string Look::moveAside(const FileURL& url) const {
     const std::string name(url.lastPathComponent());
     const std::string aside =
         system_.root().path(names::rootHome) + "/" + std::string(parent.lastPathComponent()) + "-" + name + ".aside";
-    // What lies there from before gets a number: -n would move nothing, and call that done.
+    // An item that lies there from before gets a number: -n would move nothing, and call that done.
     return inDirectory(parent.path(), "mv --backup=numbered -T -- " + shellQuoted(name) + " " + shellQuoted(aside));
 }
 

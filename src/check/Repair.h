@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
-// What puts findings right, as a list: it is shown, or gone through, and is the same in both cases.
+// The steps that put findings right, as a list: it is shown, or gone through, and is the same in both cases.
 //
-// Only what a running daemon does when it is asked is ever done. What its next start does is left to that, and what
+// Only what a running daemon does when it is asked is ever done. The work of its next start is left to that, and what
 // needs a person to a person: in doubt nothing is deleted.
 #pragma once
 
@@ -18,14 +18,14 @@ struct RepairStep {
         none,
         /// The standard subdirectories of the container below are made again, with their owner and mode.
         recreateStructure,
-        /// What waits for its deletion is deleted.
+        /// The items that wait for their deletion are deleted.
         emptyDeathRow,
     };
     Act act = Act::none;
     Mender mender = Mender::person;
     /// One line for people: what is done, or has to be. May quote names.
     std::string text;
-    /// What a person may type to have it done; empty when there is nothing to type.
+    /// The command that a person may type to have it done; empty when there is nothing to type.
     std::string command;
     // The container that it is done to.
     ContainerClass containerClass = ContainerClass::undefined;

@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // Reads a store as it lies, with the daemon's own readers, and says what is wrong with it.
 //
-// Nothing is ever written, no lock is taken, no link is followed, nothing that could block is opened. What a request in
-// flight shows is not reported: where a first look finds something, a second one follows, and only what both saw
-// counts. Containers are looked at one after another; memory grows with the number of identifiers in one class
+// Nothing is ever written, no lock is taken, no link is followed, nothing that could block is opened. A thing that a
+// request in flight shows is not reported: where a first look finds something, a second one follows, and only what both
+// saw counts. Containers are looked at one after another; memory grows with the number of identifiers in one class
 // directory and with the findings. One thread.
 #pragma once
 

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What build the device runs, from files below DIR/etc. Read anew each time; any thread.
+// The build that the device runs, from files below DIR/etc. Read anew each time; any thread.
 #pragma once
 
 #include "os/SystemRoot.h"

@@ -12,7 +12,7 @@ namespace zor::platform {
 class FileCrashAnnotation final : public CrashAnnotation {
 public:
     FileCrashAnnotation(const SystemRoot& root, Disk& disk) : root_(root), disk_(disk) {}
-    /// Where the file cannot be written the message goes to the system's own log instead.
+    /// The message goes to the system's own log where the file cannot be written.
     void record(std::string_view message) override;
 
 private:

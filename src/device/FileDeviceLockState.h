@@ -42,7 +42,7 @@ private:
         [[nodiscard]] bool isOf(const struct stat& status) const;
     };
     [[nodiscard]] int readState() const;
-    /// What a look that failed says.
+    /// The state that a look gives that failed.
     [[nodiscard]] int stateUnread(int error) const;
     [[nodiscard]] bool takeEvents() const;
     /// 0, or the errno for which there are no notices.

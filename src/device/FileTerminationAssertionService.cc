@@ -104,7 +104,7 @@ std::expected<FileDescriptor, int> FileTerminationAssertionService::lockFile(con
     const auto directory = openDirectory();
     if (!directory)
         return std::unexpected(directory.error());
-    // What an earlier daemon left may be open in a launcher that waits on it; a new file cannot be.
+    // A file that an earlier daemon left may be open in a launcher that waits on it; a new file cannot be.
     const int removed = disk_.unlinkFile(directory->get(), name.c_str());
     if (removed < 0 && removed != -ENOENT)
         return std::unexpected(-removed);

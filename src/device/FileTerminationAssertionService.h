@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // Termination assertions as locked files: DIR/run/zorvane/assertions/IDENTIFIER holds the reason's number and is locked
-// with flock while the assertion is. Whoever starts programs tries the lock for sharing, and starts nothing that it
+// with flock while the assertion is. A launcher of programs tries the lock for sharing, and starts nothing that it
 // does not get.
 //
 // Several assertions on one application share its file; the last to end removes it. A kill ends the lock with the

@@ -39,7 +39,7 @@ void forEachSandboxDirectory(const SystemRoot& root, const std::function<void(co
                                          const std::function<bool(const std::string& path)>& isGone);
 
 // Sandbox mappings as symbolic links: run/zorvane/sandbox/<uid>/<item type>/<identifier, percent-encoded> points to the
-// container. Whoever builds a sandbox reads them.
+// container. The builder of a sandbox reads them.
 //
 // A mapping is replaced by rename: a reader sees the old or the new one. A failure in the middle leaves a hidden name,
 // which the next launch removes. The directory is root's and ends with the boot, so nothing is synced.

@@ -20,8 +20,8 @@ public:
     /// owner can forge.
     XattrProtectionClass(Disk& disk, const DeviceLockState& lockState);
 
-    /// What an attribute of an open file says; nullopt when it has none (or its file system has none at all). A value
-    /// that is no class of ours reads as the default. Else an errno.
+    /// The class that an attribute of an open file says; nullopt when it has none (or its file system has none at all).
+    /// A value that is no class of ours reads as the default. Else an errno.
     [[nodiscard]] static std::expected<std::optional<int>, int> classIn(int fd, const char* attribute);
 
     [[nodiscard]] std::expected<int, int> classOf(int fd) const override;

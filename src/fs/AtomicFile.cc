@@ -21,7 +21,7 @@ constexpr std::size_t randomCharacters = 6;
 constexpr int namesTriedMax = 16;
 
 constexpr std::string_view temporaryMark = ".new-";
-/// Of the one name that a target's writes use, so that the next one finds what a stop left of the last: looking for it
+/// The one name that a target's writes use, so that the next one finds what a stop left of the last: looking for it
 /// would be a walk of a directory that its owner may have filled.
 constexpr std::string_view usualSuffix = "000000";
 static_assert(usualSuffix.size() == randomCharacters);

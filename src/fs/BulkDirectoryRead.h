@@ -35,8 +35,8 @@ public:
     const Entry* next();
     /// 0, or the errno of the read that ended the entries.
     [[nodiscard]] int error() const { return error_; }
-    /// Where the entry after the last one given begins. Good for seek(), on this or another descriptor of the same
-    /// directory.
+    /// The place at which the entry after the last one given begins. Good for seek(), on this or another descriptor of
+    /// the same directory.
     [[nodiscard]] off_t position() const { return position_; }
     /// Goes on at a position; 0 is the beginning. 0 or -errno.
     int seek(off_t position);

@@ -66,7 +66,7 @@ public:
 private:
     struct Level {
         ino_t inode = 0;
-        /// Where reading goes on when the level is opened again.
+        /// The place at which reading goes on when the level is opened again.
         off_t resume = 0;
         /// Length of the path up to and with this level's name.
         std::size_t pathBytes = 0;

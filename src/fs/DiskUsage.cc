@@ -25,13 +25,13 @@ using platform::FileDescriptor;
 
 namespace {
 
-// What may wait at once; beyond it a directory is measured when it is met.
+// The directories that may wait at once; beyond that a directory is measured when it is met.
 constexpr std::size_t queuedDirectoriesMax = 65'536;
 constexpr std::size_t queuedBytesMax = 16 * 1024 * 1024;
 constexpr std::uint64_t blockBytes = 512;
 constexpr std::uint32_t xfsMagic = 0x58465342;
 
-/// What the type of the tree's file system tells.
+/// The traits that the type of the tree's file system tells.
 struct FileSystemTraits {
     /// The greatest size that a directory without entries has, where every directory with entries is larger. There a
     /// status tells what would else take an open and a read.
@@ -179,7 +179,7 @@ void Measurement::measureEntries(int directory, const std::string& path) {
         log_.write(logLevelError,
                    formatted("scanbatch on entry %llu in %s returned error %s", static_cast<unsigned long long>(index),
                              ZOR_SHOWN(fullPath(path)), errorText(entries.error())));
-    // Where only the reading tells that there is nothing, this is when it is known.
+    // The end, where only the reading tells that there is nothing.
     if (index == 0 && entries.error() == 0 && !path.empty())
         sayEmpty(path);
 }

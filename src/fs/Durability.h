@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What makes a change survive a power cut, on the file system that it is made on.
+// The syncs that make a change survive a power cut, on the file system that it is made on.
 //
 // A new container is built in staging and becomes visible with one move. Two things must hold: when the move is on the
 // disk, so is all that it moved; and when the client has its answer, the move is on the disk.

@@ -33,7 +33,7 @@ struct MountTop {
 /// is not the daemon's has its name.
 [[nodiscard]] OpenResult openDeathRow(int top);
 [[nodiscard]] OpenResult openOrMakeDeathRow(platform::Disk& disk, int top);
-/// Leaves one that is not empty. Whoever moves an item in has to make sure that it is not removed before.
+/// Leaves one that is not empty. The caller that moves an item in has to make sure that it is not removed before.
 void removeEmptyDeathRow(platform::Disk& disk, int top);
 
 } // namespace zor::fs

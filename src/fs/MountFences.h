@@ -7,7 +7,7 @@
 // mount. That of a home is judged whenever it is another than before: a file system that a user serves (FUSE) is no
 // home, EXDEV; one that is not of this machine may stop answering. Such a home is asked on a thread of its own whether
 // it still answers, at most once in `answerHoldsMilliseconds`, and while it does not, all that leads there fails
-// with EHOSTDOWN at once. What is not defended: a home that stops answering within that time holds the thread that is
+// with EHOSTDOWN at once. Not defended: a home that stops answering within that time holds the thread that is
 // there.
 //
 // Changes nothing on the disk. Any thread; fences are added, never taken away.

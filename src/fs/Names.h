@@ -6,7 +6,7 @@
 
 namespace zor::fs {
 
-// Names that a stop may leave behind. None of them is ever taken for the real thing. What an atomic write leaves is
+// Names that a stop may leave behind. None of them is ever taken for the real thing. The leftover of an atomic write is
 // named in AtomicFile.h.
 
 /// How a copy across file systems is named until it is whole.

@@ -66,7 +66,8 @@ public:
     [[nodiscard]] std::expected<ParentAndName, int> openParent(const FileURL& url) const;
     /// lstat: 0 or an errno.
     [[nodiscard]] int status(const FileURL& url, struct stat& status) const;
-    /// Where a path begins for who makes what is missing on it: at its fence, which has to be there, or at the root.
+    /// The beginning of a path for a caller that makes its missing parts: at its fence, which has to be there, or at
+    /// the root.
     struct Way {
         FileDescriptor fence;
         int base = -1;

@@ -28,9 +28,9 @@ using platform::FileDescriptor;
 namespace {
 
 constexpr mode_t permissionBits = 07777;
-/// What a copied file keeps of its mode: set-user-ID and set-group-ID are not copied.
+/// The bits of its mode that a copied file keeps: set-user-ID and set-group-ID are not copied.
 constexpr mode_t filePermissionBits = 01777;
-/// What content keeps of it.
+/// The bits that content keeps.
 constexpr mode_t accessBits = 0777;
 
 /// The ways in which a file system, or a limit of it, says that a second link cannot be.
@@ -53,7 +53,7 @@ class Copier {
 public:
     Copier(platform::Disk& disk, int toDirectory, const char* to)
         : disk_(disk), attributes_(disk), data_(disk), toDirectory_(toDirectory), to_(to) {}
-    /// Of content, into `toDirectory` itself.
+    /// The copy of content, into `toDirectory` itself.
     Copier(platform::Disk& disk, int toDirectory, const ContentRules& rules)
         : disk_(disk), attributes_(disk), data_(disk, rules.copied), toDirectory_(toDirectory), to_("."),
           rules_(&rules) {}
@@ -85,7 +85,7 @@ private:
     /// nullptr: everything comes along.
     const ContentRules* const rules_ = nullptr;
     DirectoryStack destination_;
-    /// Of the source's directory of each level, from before it was read.
+    /// The status of the source's directory of each level, from before it was read.
     std::vector<timespec> accessTimes_;
     FileDescriptor links_;
     std::string linksName_;

@@ -78,7 +78,7 @@ int Remover::remove(int directory, const char* name) {
 WalkStep Remover::visit(const WalkEntry& entry) {
     switch (entry.kind) {
     case WalkEntryKind::directory:
-        // What was doomed at this depth was a directory before this one.
+        // The doomed names of this depth belong to a directory before this one.
         doomedDepth_ = std::min(doomedDepth_, static_cast<long>(entry.depth) - 1);
         return WalkStep::proceed;
     case WalkEntryKind::directoryEnd:

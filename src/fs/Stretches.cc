@@ -13,7 +13,7 @@ namespace {
 
 /// Below this many a second thread costs more than it brings.
 constexpr std::size_t countForTwoThreads = 256;
-/// What one thread takes at a time.
+/// The number that one thread takes at a time.
 constexpr std::size_t stretchCount = 32;
 
 } // namespace

@@ -40,12 +40,12 @@ struct WalkEntry {
     WalkEntryKind kind = WalkEntryKind::noStatus;
     /// The open directory that holds the entry. All descriptors belong to the walker and are good for this call only.
     int parent = -1;
-    /// One component. Who acts on it must be ready to find something else there by now.
+    /// One component. A caller that acts on it must be ready to find something else there by now.
     const char* name = nullptr;
     /// For a directory that could be opened: the directory itself. Else -1.
     int directory = -1;
-    /// Of the item, never of what a link points to. With WalkStatus::typeOnly, and on other file systems, only the type
-    /// in st_mode and st_ino mean something.
+    /// The item's own, never that of a link's target. With WalkStatus::typeOnly, and on other file systems, only the
+    /// type in st_mode and st_ino mean something.
     struct stat status{};
     int error = 0;
     /// Lies on another file system than the root: leave it alone.

@@ -143,8 +143,8 @@ Result<void> ZORFileManager::mendDirectory(int directory, const FileURL& url, co
     const mode_t mode = status.st_mode & permissionBits;
     if (groupFits && mode == attributes.mode)
         return {};
-    // Who can write the parent can have given its name to another directory of this owner's, one that is closed for a
-    // reason. Only who may write the directory itself can move it to another parent meanwhile.
+    // Whatever user can write the parent can have given its name to another directory of this owner's, one that is
+    // closed for a reason. Only who may write the directory itself can move it to another parent meanwhile.
     if (::fstatat(directory, "..", &parent, 0) != 0)
         return posixError(ZOR_HERE, errno, "opendir of %s failed: %s", url.c_str(), errorText(errno));
     const bool othersCanName = (parent.st_mode & (S_IWGRP | S_IWOTH)) != 0 ||
@@ -190,7 +190,7 @@ Result<FileDescriptor> ZORFileManager::makeNewDirectory(const Base& base, std::s
     if (!directory)
         return posixError(ZOR_HERE, directory.error(), "opendir of %s failed: %s", temporaryPath.c_str(),
                           errorText(directory.error()));
-    // Whoever can write the parent can have put another directory there.
+    // A user who can write the parent can have put another directory there.
     if (!fs::isFreshDirectory(directory->get()))
         return posixError(ZOR_HERE, EPERM, "%s was exchanged while it was made; it stays as it is",
                           temporaryPath.c_str());

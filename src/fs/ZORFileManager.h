@@ -6,7 +6,7 @@
 // moment, what a descriptor names may not. Failures are POSIX-domain errors that carry the words below and are not
 // logged here; whoever returns them to a client logs.
 //
-// What a stop in the middle leaves: of a new directory, a sibling named "NAME.XXXXXX"; of a move across file systems, a
+// A stop in the middle leaves: of a new directory, a sibling named "NAME.XXXXXX"; of a move across file systems, a
 // hidden ".zorvaned-copy-XXXXXX" beside the destination or where the source was. Neither is ever taken for the real
 // thing.
 #pragma once
@@ -118,7 +118,7 @@ public:
     Result<void> forEachItemInDirectoryAtURL(const FileURL& directory, Leftovers leftovers, const ItemVisitor& visitor);
     /// The same of a directory that is open; `url` is its name in messages.
     Result<void> forEachItemIn(int directory, const FileURL& url, Leftovers leftovers, const ItemVisitor& visitor);
-    /// What moves across file systems that were cut short left in a directory. Empty when it cannot be read.
+    /// The leftovers in a directory of moves across file systems that were cut short. Empty when it cannot be read.
     std::vector<FileURL> copyLeftoversInDirectoryAtURL(const FileURL& directory);
     /// The same for files whose atomic writing was cut short.
     std::vector<FileURL> writeLeftoversInDirectoryAtURL(const FileURL& directory);

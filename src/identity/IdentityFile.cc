@@ -110,7 +110,7 @@ Problem readEntry(const plist::Dictionary& file, RegistryEntry& entry) {
     return readGrant(file, entry);
 }
 
-/// What lets its holder act on containers of others.
+/// The entitlements that let their holder act on containers of others.
 bool isPowerful(const IdentityGrant& grant) {
     if (grant.kernelAgent)
         return true;

@@ -57,7 +57,7 @@ std::optional<FileId> IdentityRegistry::executableAt(const std::string& path) {
 
 void IdentityRegistry::lookIfDue(std::int64_t now) {
     std::int64_t due = dueMilliseconds_.load(std::memory_order_relaxed);
-    // Of the threads that come by, one does it; the others go on with what is known.
+    // One of the threads that come by does it; the others go on with what is known.
     if (now < due || !dueMilliseconds_.compare_exchange_strong(due, now + lookEveryMilliseconds))
         return;
     const MutexLock lock(reading_);
@@ -90,7 +90,8 @@ void IdentityRegistry::lookAtNotices() {
 void IdentityRegistry::look(Read read) {
     lookedMilliseconds_ = coarseMilliseconds();
     dueMilliseconds_.store(lookedMilliseconds_ + lookEveryMilliseconds, std::memory_order_relaxed);
-    // What a look could not finish is read whole by the next one: the notice that it was for has been taken.
+    // A directory that a look could not finish is read whole by the next one: the notice that it was for has been
+    // taken.
     if (!hasLooked_)
         read = Read::all;
     else if (read == Read::changed && looksUnchanged(*snapshot()))
@@ -147,7 +148,7 @@ std::vector<IdentityRegistry::Registered> IdentityRegistry::readEntries(const Re
                                     .isShortage = parsed.error().isShortage});
                 continue;
             }
-            // Who was granted the same keeps the same object.
+            // A peer that was granted the same keeps the same object.
             if (!entry || *entry != *parsed)
                 entry = std::make_shared<const RegistryEntry>(std::move(*parsed));
         }

@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // The identity registry: which executables the daemon knows, from the files in DIR/etc/zorvane/identities.d.
 //
-// What was read is an immutable snapshot with a number, its generation. Peers remember which generation they were
-// judged by; as long as it is the current one their judgement holds, and to ask costs one atomic read: no lock, no
+// The registry as read is an immutable snapshot with a number, its generation. Peers remember which generation they
+// were judged by; as long as it is the current one their judgement holds, and to ask costs one atomic read: no lock, no
 // call.
 //
 // Changes are found in two ways, and either alone is enough. Notices (inotify) of the directory and of those that the
@@ -12,8 +12,8 @@
 // A look for which there was no descriptor or no memory changes nothing: what was known holds, and the next one who
 // asks looks again.
 //
-// What does not count (RegistryDirectory says what) is said in the log, once for each change. Any thread. `reading_` is
-// held while files are read, `publishing_` only to hand out the snapshot.
+// A file that does not count (RegistryDirectory judges) is told in the log, once for each change. Any thread.
+// `reading_` is held while files are read, `publishing_` only to hand out the snapshot.
 #pragma once
 
 #include "base/Mutex.h"
@@ -36,7 +36,7 @@ public:
     struct Registered {
         std::string fileName;
         std::shared_ptr<const RegistryEntry> entry;
-        /// What the entry's path named when it was looked at last; absent when that was no file.
+        /// The file that the entry's path named when it was looked at last; absent when that was no file.
         std::optional<FileId> executable;
         bool operator==(const Registered&) const = default;
     };
@@ -57,7 +57,7 @@ public:
     bool follow(RunLoop& loop);
     void unfollow(RunLoop& loop);
 
-    /// Of the current snapshot; never 0.
+    /// The generation of the current snapshot; never 0.
     [[nodiscard]] std::uint64_t generation() const { return generation_.load(std::memory_order_acquire); }
     [[nodiscard]] std::shared_ptr<const Snapshot> snapshot() const ZOR_EXCLUDES(publishing_);
 
@@ -68,7 +68,7 @@ public:
     /// For a peer that no entry names: looks at everything again, unless that was done a moment ago. Whether it did.
     bool lookAgain() ZOR_EXCLUDES(reading_);
 
-    /// What `path` names now, when that is a regular file. Follows links.
+    /// The file that `path` names now, when that is a regular one. Follows links.
     [[nodiscard]] static std::optional<FileId> executableAt(const std::string& path);
 
 private:

@@ -41,7 +41,7 @@ public:
     /// The program that a process runs, by its /proc directory; or the errno of the look.
     [[nodiscard]] static std::expected<Executable, int> executableOf(int process);
 
-    /// What the kernel said when the connection was accepted.
+    /// The kernel's words when the connection was accepted.
     struct Accepted {
         pid_t pid = 0;
         // Effective ones, of the moment of the connect.

@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// Who is behind a connected socket: what the kernel recorded when it connected, and the process itself. Any thread.
+// The process behind a connected socket: what the kernel recorded when it connected, and the process itself. Any
+// thread.
 #pragma once
 
 #include "identity/AddressSpace.h"

@@ -18,7 +18,7 @@
 
 namespace zor::platform {
 
-/// What makes a file the same one, whatever its name in whichever mount namespace.
+/// The marks by which a file is the same one, whatever its name in whichever mount namespace.
 struct FileId {
     dev_t device = 0;
     ino_t inode = 0;

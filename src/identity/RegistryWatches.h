@@ -36,7 +36,7 @@ public:
     void end();
 
 private:
-    /// What matters in one directory: these names, or everything.
+    /// The names that matter in one directory, or everything.
     struct Interest {
         Noticed kind = Noticed::nothing;
         bool everything = false;

@@ -27,9 +27,9 @@ struct FrameHeader {
     std::uint64_t id = 0;
 
     [[nodiscard]] bool expectsReply() const { return (flags & frameExpectsReply) != 0; }
-    /// What a daemon may read: a length from 1 to requestPayloadBytesMax, and no flag but frameExpectsReply.
+    /// A header that a daemon may read: a length from 1 to requestPayloadBytesMax, and no flag but frameExpectsReply.
     [[nodiscard]] bool isValidRequest() const;
-    /// What a client may read: a length of at least 1, and exactly the flag frameIsReply.
+    /// A header that a client may read: a length of at least 1, and exactly the flag frameIsReply.
     [[nodiscard]] bool isValidReply() const;
 
     bool operator==(const FrameHeader&) const = default;

@@ -117,7 +117,7 @@ namespace infoKeys {
 inline constexpr std::string_view staticDiskUsage = "com.veltra.Brevance.StaticDiskUsage";
 /// Integer: the data-protection class that was asked for last; absent reads as 3.
 inline constexpr std::string_view contentProtectionClass = "com.veltra.Brevance.ContentProtectionClass";
-/// What older systems kept in a data container of the groups that its identifier is entitled to.
+/// The groups that an identifier is entitled to, as older systems kept them in its data container.
 inline constexpr std::string_view groupContainerIds = "com.veltra.Brevance.GroupContainerIDs";
 } // namespace infoKeys
 

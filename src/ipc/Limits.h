@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What a frame may measure. The daemon and its clients read the same numbers.
+// The sizes that a frame may have. The daemon and its clients read the same numbers.
 #pragma once
 
 #include <cstddef>

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// Where clients find the daemon. Paths are relative to the system root, which is / on a device.
+// The places where clients find the daemon. Paths are relative to the system root, which is / on a device.
 #pragma once
 
 #include <string_view>

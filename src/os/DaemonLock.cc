@@ -16,7 +16,7 @@
 namespace zor::platform {
 
 namespace {
-/// Whoever can open the file can hold the lock and keep the daemon from starting.
+/// A process that can open the file can hold the lock and keep the daemon from starting.
 constexpr mode_t lockMode = 0600;
 /// A line of /proc/locks is about 60 bytes.
 constexpr std::size_t lockListBytesMax = std::size_t{16} << 20;

@@ -48,7 +48,7 @@ bool EpollRunLoop::watch(int fd, std::function<void()> ready) {
 }
 
 void EpollRunLoop::unwatch(int fd) {
-    // What a callback holds may unwatch in its turn when it goes: it goes after the lock.
+    // An object that a callback holds may unwatch in its turn when it goes: it goes after the lock.
     std::shared_ptr<std::function<void()>> gone;
     const MutexLock lock(mutex_);
     for (auto it = watches_.begin(); it != watches_.end(); ++it) {

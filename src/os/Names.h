@@ -9,7 +9,7 @@
 
 namespace zor::platform::names {
 
-// What the daemon reads.
+// Files that the daemon reads.
 inline constexpr const char* identityDirectory = "etc/zorvane/identities.d";
 inline constexpr const char* identityFileSuffix = ".plist";
 inline constexpr const char* wellKnownTable = "etc/zorvane/wellknown.plist";
@@ -17,7 +17,7 @@ inline constexpr const char* internalBuildMark = "etc/zorvane/internal-build";
 inline constexpr const char* operatingSystemRelease = "etc/os-release";
 inline constexpr const char* passwordFile = "etc/passwd";
 
-// What lives as long as the boot. Single names lie in runtimeDirectory.
+// Names that live as long as the boot. Single names lie in runtimeDirectory.
 inline constexpr const char* runParent = "run";
 inline constexpr const char* runtimeName = "zorvane";
 inline constexpr const char* runtimeDirectory = ipc::runtimeDirectory.data();
@@ -36,7 +36,7 @@ inline constexpr const char* crashFile = "zorvaned.crash";
 
 // POSIX semaphore, followed by "." and a hash of the root unless that is "/".
 inline constexpr const char* bootMarker = "zorvaned.fb_check";
-/// Where the C library keeps a semaphore named X: in the file sem.X there.
+/// The directory in which the C library keeps a semaphore named X, in the file sem.X.
 inline constexpr const char* semaphoreDirectory = "/dev/shm";
 inline constexpr const char* semaphoreFilePrefix = "sem.";
 /// The second boot marker, in runtimeDirectory.

@@ -48,7 +48,7 @@ std::expected<FileDescriptor, int> openBeneath(int directory, const char* relati
 }
 
 std::expected<FileDescriptor, int> openBeneathOnMount(int directory, const char* relativePath, int flags) {
-    // Where no link is followed, only these lead out. RESOLVE_BENEATH would find them too, at a tenth of the price of
+    // These alone lead out where no link is followed. RESOLVE_BENEATH would find them too, at a tenth of the price of
     // the whole call, which walks of large trees make for every directory.
     if (relativePath[0] == '/' || hasParentComponent(relativePath))
         return std::unexpected(EXDEV);

@@ -17,7 +17,7 @@ constexpr int ioprioClassIdle = 3;
 constexpr int ioprioClassShift = 13;
 
 void becomeBackground() {
-    // Both act on the calling thread. Where they are refused the queue works all the same.
+    // Both act on the calling thread. The queue works all the same without them.
     const sched_param parameters{};
     (void)::sched_setscheduler(0, SCHED_IDLE, &parameters);
     (void)::syscall(SYS_ioprio_set, ioprioWhoProcess, 0, ioprioClassIdle << ioprioClassShift);

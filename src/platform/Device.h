@@ -86,7 +86,7 @@ public:
     /// Calls `changed` on the loop whenever the state may have changed. 0, else a status to log: changes are then found
     /// a moment late, until it can be done as it should.
     virtual int registerForChanges(RunLoop& loop, std::function<void()> changed) = 0;
-    /// What the two log lines of a failed registration name.
+    /// The names in the two log lines of a failed registration.
     [[nodiscard]] virtual const char* registrationCallName() const = 0;
     [[nodiscard]] virtual const char* notificationName() const = 0;
 };
@@ -115,7 +115,7 @@ public:
 
 // Tells the sandbox which directory is the container of (user, item type, identifier).
 
-/// What a mapping names; the numbers are the sandbox's own.
+/// The kinds of mapping; the numbers are the sandbox's own.
 enum class SandboxItemType : std::uint64_t { dataContainer = 1, groupContainer = 2 };
 
 class SandboxUserState {

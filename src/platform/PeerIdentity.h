@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// Who is at the other end of a connection, as the kernel and the identity registry vouch for it.
+// The program at the other end of a connection, as the kernel and the identity registry vouch for it.
 #pragma once
 
 #include "plist/Value.h"
@@ -12,8 +12,8 @@
 
 namespace zor::platform {
 
-/// What the registry grants to one executable. Immutable and shared: a peer's dictionary is handed out by pointer,
-/// never copied, and two messages of an unchanged peer get the very same object.
+/// The powers that the registry grants to one executable. Immutable and shared: a peer's dictionary is handed out by
+/// pointer, never copied, and two messages of an unchanged peer get the very same object.
 struct IdentityGrant {
     std::optional<std::string> identifier;
     std::optional<plist::Dictionary> entitlements;
@@ -40,8 +40,8 @@ struct Identity {
 class Peer {
 public:
     virtual ~Peer() = default;
-    /// Who the peer is now. Checked against the kernel on every call: a peer that has executed another program, or has
-    /// exited, stops being what it was. Cheap when nothing changed: no allocation, and `explanation` is left empty
+    /// The peer as it is now. Checked against the kernel on every call: a peer that has executed another program, or
+    /// has exited, stops being what it was. Cheap when nothing changed: no allocation, and `explanation` is left empty
     /// unless asked for.
     enum class Explain { no, yes };
     [[nodiscard]] virtual Identity identify(Explain explain) = 0;

@@ -17,9 +17,9 @@
 
 namespace zor::platform {
 
-// The named service: connections, frames, replies. What a message means is the handler's business.
+// The named service: connections, frames, replies. The meaning of a message is the handler's business.
 
-/// Where the reply to one request goes. Copies share the destination; the first send counts. Any thread.
+/// The destination of the reply to one request. Copies share the destination; the first send counts. Any thread.
 class ReplyChannel {
 public:
     virtual ~ReplyChannel() = default;

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the reader and the writer of the binary form share: markers and sizes.
+// The markers and sizes that the reader and the writer of the binary form share.
 #pragma once
 
 #include <cstddef>

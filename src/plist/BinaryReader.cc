@@ -37,7 +37,7 @@ public:
     std::expected<Value, ReadError> read();
 
 private:
-    /// What an object's marker says, and where its content starts.
+    /// An object's marker as it reads, and the place where its content starts.
     struct Header {
         Kind kind{};
         std::uint8_t low = 0;

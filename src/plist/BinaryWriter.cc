@@ -47,7 +47,7 @@ public:
 
     std::size_t objects = 0;
     std::size_t references = 0;
-    /// Of all objects, without the references in containers.
+    /// The sum over all objects, without the references in containers.
     std::size_t bytes = 0;
     const char* reason = nullptr;
 
@@ -188,7 +188,7 @@ template <typename Root>
 void Writer::write(const Root& root) {
     putBytes(binary::magic.data(), binary::magic.size());
     writeObject(root);
-    // What was measured and what was written are one size, or memory is already damaged.
+    // The size measured and the size written are the same, or memory is already damaged.
     if (at_ != table_ || next_ != objects_)
         __builtin_trap();
     at_ += objects_ * offsetWidth_;

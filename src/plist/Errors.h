@@ -9,9 +9,9 @@
 namespace zor::plist {
 
 struct ReadError {
-    /// Where in the input, in bytes.
+    /// The place in the input, in bytes.
     std::size_t offset = 0;
-    /// What is wrong there, in words. Never null, lives for ever.
+    /// The fault there, in words. Never null, lives for ever.
     const char* reason = "";
 
     /// "byte 12: not a property list"

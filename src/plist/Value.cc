@@ -50,7 +50,7 @@ Dictionary::Dictionary(std::initializer_list<Entry> entries) : Dictionary(fromUn
 Dictionary Dictionary::fromUnsorted(std::vector<Entry> entries) {
     Dictionary result;
     const auto notAscending = [](const Entry& left, const Entry& right) { return left.first >= right.first; };
-    // What the writer wrote comes back sorted.
+    // The writer's own output comes back sorted.
     if (std::adjacent_find(entries.begin(), entries.end(), notAscending) == entries.end()) {
         result.entries_ = std::move(entries);
         return result;
@@ -62,7 +62,7 @@ Dictionary Dictionary::fromUnsorted(std::vector<Entry> entries) {
         return compared != 0 ? compared < 0 : left < right;
     });
     putInOrder(entries, order);
-    // Of a run of equal keys only the last stays.
+    // The last of a run of equal keys stays, no other.
     std::size_t kept = 0;
     for (std::size_t at = 0; at < entries.size(); ++at)
         if (at + 1 == entries.size() || entries[at].first != entries[at + 1].first) {

@@ -119,7 +119,7 @@ private:
 /// <hex>, cut at `bytesMax`. "(null)" for nullptr.
 std::string describe(const Value* value, std::size_t bytesMax = 1024);
 
-// What a value costs to keep.
+// The memory that a value keeps.
 
 /// About what it takes in memory, in bytes, itself and all below it.
 [[nodiscard]] std::size_t heldBytes(const Value& value);

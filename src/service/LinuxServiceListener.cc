@@ -54,8 +54,8 @@ private:
     void arm() { [[maybe_unused]] const bool armed = core_.pool.rearm(socket_, *this, EPOLLIN); }
 
     void admit(PeerSocket socket) {
-        // Who connected before the listening socket came to the daemon has not taken it over. What such a one has sent
-        // would come with descriptors in the place of credentials.
+        // A peer that connected before the listening socket came to the daemon has not taken it over. Whatever such a
+        // one has sent would come with descriptors in the place of credentials.
         if (const int error = enableSenderCredentials(socket.get()); error != 0)
             return core_.incidents.happened(ListenerIncident::unknownPeer, error);
         ucred credentials = {};

@@ -25,7 +25,7 @@ namespace zor::platform {
 struct ListenerCore;
 
 struct ListenerOptions {
-    /// Where the socket is made (mode 0666) and, on stop, removed.
+    /// The place where the socket is made (mode 0666) and, on stop, removed.
     ListenerAddress address;
     /// A listening socket that the service manager made; when valid it is used, and the address is not.
     FileDescriptor passed;

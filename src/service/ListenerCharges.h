@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// Who uses how much of the listener: connections and buffered bytes, counted for each user and in all.
+// Each user's part of the listener: connections and buffered bytes, counted for each user and in all.
 //
 // Users that the system does not know count as one (UserNumbers.h). So there are so few accounts that they stay for the
 // listener's life. Every charge is given back by the object that took it; at the end everything is zero again, and the
@@ -57,7 +57,7 @@ private:
     /// By countedUserId, but for owners of the root.
     std::map<uid_t, Account> accounts_ ZOR_GUARDED_BY(mutex_);
     Totals totals_ ZOR_GUARDED_BY(mutex_);
-    /// What those have of it who do not own the root.
+    /// The part of it that belongs to users who do not own the root.
     Totals ofOthers_ ZOR_GUARDED_BY(mutex_);
 };
 

@@ -223,7 +223,7 @@ bool ListenerConnection::letGo() {
         events = eventsWanted();
         Arming expected = Arming::no;
         if (!arming_.compare_exchange_strong(expected, Arming::underway)) {
-            // The worker that had it before is not through yet. What it arms now is out of date, and it will see that.
+            // The worker that had it before is not through yet. Its arming is out of date, and it will see that.
             held_ = !core_.pool.rearm(descriptor_, *this, events);
             return !held_;
         }

@@ -2,7 +2,7 @@
 // One client's connection. Objects are reused and live as long as the listener, so an event that is out of date finds
 // an object, and that the object tells it so.
 //
-// A connection is either armed in epoll, or *held* by one worker (also while it is requeued). Whoever holds it reads,
+// A connection is either armed in epoll, or *held* by one worker (also while it is requeued). Its holder reads,
 // serves and closes; nobody else does. Replies may be sent by any thread at any time: a thread that does not hold the
 // connection arms it again under the mutex, so that the unsent rest is looked after.
 #pragma once
@@ -92,7 +92,7 @@ private:
 
     ListenerCore& core_;
 
-    // Of whoever holds the connection.
+    // Members of the connection's holder.
     ListenerInput input_;
     std::unique_ptr<Peer> peer_;
     /// Used again for the next request when nobody else has kept it.

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the connections of one listener share. It outlives them while they are open.
+// The state that the connections of one listener share. It outlives them while they are open.
 #pragma once
 
 #include "base/Mutex.h"

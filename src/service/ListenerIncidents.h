@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// What goes wrong on connections, counted, and told to whoever keeps the log: of each kind a line now and then, so that
-// clients cannot fill it. Any thread.
+// Everything that goes wrong on connections, counted, and told to the keeper of the log: of each kind a line now and
+// then, so that clients cannot fill it. Any thread.
 #pragma once
 
 #include <array>
@@ -51,7 +51,7 @@ private:
     struct Kind {
         std::atomic<std::uint64_t> count{0};
         std::atomic<std::uint64_t> countTold{0};
-        /// Of the steady clock.
+        /// A time of the steady clock.
         std::atomic<std::int64_t> tellFromSeconds{0};
     };
     const ListenerReport report_;

@@ -40,7 +40,7 @@ public:
         /// The user has too much buffered.
         tooMuch,
     };
-    /// Receives once. What is pending is the beginning of one frame with a valid header, or less.
+    /// Receives once. The pending bytes are the beginning of one frame with a valid header, or less.
     [[nodiscard]] Received receive(int socket, ListenerScratch& scratch);
     /// Whether the last receive took all it had room for, so that there may be more.
     [[nodiscard]] bool filled() const { return filled_; }
@@ -53,7 +53,7 @@ public:
     [[nodiscard]] bool keep();
 
 private:
-    /// Where the next bytes go: first behind what is kept, then into the scratch buffer behind what lies there.
+    /// The place of the next bytes: first behind what is kept, then into the scratch buffer behind what lies there.
     struct Room {
         std::size_t kept = 0;
         std::size_t scratch = 0;

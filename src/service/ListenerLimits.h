@@ -22,13 +22,13 @@ struct ListenerLimits {
     /// Connections in all, and of any one user that does not own the root.
     std::size_t connectionsMax = 4096;
     std::size_t connectionsMaxPerUser = 1024;
-    /// Of connectionsMax, kept for the owners of the root: all users together cannot lock them out.
+    /// The part of connectionsMax that is kept for the owners of the root: all users together cannot lock them out.
     std::size_t connectionsKeptForOwners = 64;
 
     /// Bytes of requests that have not arrived whole, in all and of any one user that does not own the root.
     std::size_t inputBytesMax = std::size_t{256} << 20;
     std::size_t inputBytesMaxPerUser = std::size_t{64} << 20;
-    /// Of inputBytesMax, kept for the owners of the root.
+    /// The part of inputBytesMax that is kept for the owners of the root.
     std::size_t inputBytesKeptForOwners = std::size_t{64} << 20;
 
     /// A connection with this much reply unread is not read from: a peer that never reads cannot make the daemon work.
@@ -64,7 +64,7 @@ struct ListenerLimits {
     std::chrono::milliseconds tick{10};
 };
 
-/// What one receive can take: most requests fit several times over.
+/// The bytes that one receive can take: most requests fit several times over.
 inline constexpr std::size_t listenerScratchBytes = 32 * 1024;
 /// Input up to this size is put together in the scratch buffer; beyond it the connection's own buffer takes the rest.
 inline constexpr std::size_t listenerSmallInputBytes = 4 * 1024;

@@ -74,7 +74,7 @@ ListenerOutput::Result ListenerOutput::write(int socket, plist::Data& frame) {
 }
 
 void ListenerOutput::append(const plist::Data& frame) {
-    // What was sent goes when it is the larger part, so each byte is moved about once.
+    // The part that was sent goes when it is the larger one, so each byte is moved about once.
     if (begin_ > kept_.size() / 2) {
         kept_.erase(kept_.begin(), kept_.begin() + static_cast<std::ptrdiff_t>(begin_));
         begin_ = 0;

@@ -23,7 +23,7 @@ public:
     /// The same, for good.
     void close();
 
-    /// What is kept. This alone may be read without the mutex.
+    /// The bytes that are kept. This alone may be read without the mutex.
     [[nodiscard]] std::size_t pendingBytes() const { return pendingBytes_.load(std::memory_order_relaxed); }
 
     enum class Result { done, kept, broken, tooMuch };

@@ -100,7 +100,7 @@ private:
         std::atomic<pid_t> threadId{0};
         /// The number of tasks begun, times four, plus the phase: so "the same task still" is one comparison.
         std::atomic<std::uint64_t> state{0};
-        // What the watcher saw at its last tick.
+        // The watcher's view at its last tick.
         std::uint64_t stateSeen = 0;
         std::chrono::nanoseconds cpuTimeSeen{0};
         unsigned blockingDepth = 0;

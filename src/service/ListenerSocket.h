@@ -11,7 +11,7 @@
 
 namespace zor::platform {
 
-/// Where a socket lies. The directory belongs to the daemon's user and nobody else can write to it.
+/// The place of a socket. The directory belongs to the daemon's user and nobody else can write to it.
 struct ListenerAddress {
     /// A descriptor of the directory; its owner keeps it open.
     int directory = -1;
@@ -28,8 +28,8 @@ struct ListenerAddress {
 /// Makes a listening socket that was passed in ready for use: non-blocking, closed on exec. EINVAL when it is none.
 [[nodiscard]] int adoptListenerSocket(int socket, int type);
 
-/// Has the kernel say who sent each piece of what arrives. Whoever connects to a listening socket from then on takes it
-/// over.
+/// Has the kernel say who sent each piece of what arrives. A peer that connects to a listening socket from then on
+/// takes it over.
 [[nodiscard]] int enableSenderCredentials(int socket);
 
 /// Accepts connections of one listening socket. When the process is out of descriptors, one kept in reserve is spent to

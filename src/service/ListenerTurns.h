@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// Whose turn it is: what is ready to be served and has to wait, in one line for each user, and the lines in a ring.
+// The order of turns: what is ready to be served and has to wait, in one line for each user, and the lines in a ring.
 //
 // The kernel's list of ready descriptors goes by connection: a user with a thousand of them gets a thousand turns while
 // another gets one. So the list is the source of news alone. A worker that looks there takes everything that is ready.
@@ -9,7 +9,7 @@
 // looks for news, without waiting, before it takes one: the user who has just come is at most one turn of the others
 // away from its own. Owners of the root have a ring of their own that is looked at first.
 //
-// A turn is one frame while somebody else's line waits. Where nobody's does it may be longer, for the next frame of the
+// A turn is one frame while somebody else's line waits. It may be longer where nobody's does, for the next frame of the
 // same connection is at hand; but no longer than it may take to find out that somebody has come.
 //
 // Weighed against it: one epoll for each user, inside of one for all, tells the kernel the same, but makes every

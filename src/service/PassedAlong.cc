@@ -11,7 +11,7 @@ namespace zor::platform {
 
 namespace {
 
-// Who does not handle it ignores it, so a stray one does no harm.
+// A thread that does not handle it ignores it, so a stray one does no harm.
 constexpr int interruptSignal = SIGURG;
 
 /// No honest close takes this long; an early interrupt does no harm. The later ones are for what is waited for next.

@@ -14,8 +14,9 @@ namespace zor::platform {
 class PassedSockets {
 public:
     PassedSockets() = default;
-    /// What the variables say; nothing when they are meant for another process or make no sense. The descriptors are
-    /// this object's from then on, those that nobody takes are closed with it, and no child inherits them.
+    /// The sockets that the variables name; nothing when they are meant for another process or make no sense. The
+    /// descriptors are this object's from then on, those that nobody takes are closed with it, and no child inherits
+    /// them.
     struct Variables {
         std::string pid;
         std::string count;

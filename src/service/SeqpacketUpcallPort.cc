@@ -17,7 +17,7 @@ namespace {
 
 constexpr mode_t socketMode = 0600;
 constexpr std::size_t replyBytesWanted = std::size_t{1} << 20;
-/// What the kernel takes off a send buffer before it compares a packet with it.
+/// The bytes that the kernel takes off a send buffer before it compares a packet with it.
 constexpr std::size_t packetOverheadBytes = 32;
 /// Packets of one connection in a row, before the loop looks at what else is to be done.
 constexpr int packetsPerTurn = 16;

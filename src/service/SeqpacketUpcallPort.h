@@ -49,7 +49,7 @@ private:
     void serveConnection(int fd);
     void close(int fd);
     [[nodiscard]] Received receive(const Connection& connection, UpcallPacket& packet);
-    /// Who the packet says it is from, as the handler is to see it.
+    /// The sender that the packet names, as the handler is to see it.
     void setSender(const Connection& connection, const ucred& credentials, UpcallPacket& packet) const;
 
     const SystemRoot& root_;

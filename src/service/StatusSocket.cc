@@ -124,7 +124,7 @@ void StatusSocket::answer(int socket) {
         [[maybe_unused]] const bool taken = fits(socket); // else the stream ends early
         [[maybe_unused]] const ssize_t sent = ::send(socket, frame_.data(), frame_.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
     }
-    // What one answer needed is not kept for the next, which is likely to need less.
+    // The memory that one answer needed is not kept for the next, which is likely to need less.
     if (frame_.capacity() > frameBytesSmall)
         plist::Data().swap(frame_);
 }

@@ -16,7 +16,8 @@ namespace zor {
 
 namespace {
 
-/// What is said one by one of a directory's entries that are no containers: a user may have filled it with any number.
+/// The number of a directory's entries that are no containers and are told one by one: a user may have filled it with
+/// any number.
 constexpr std::size_t refusalsSaidMax = 200;
 
 /// The entries that could not be read as containers. Any thread.
@@ -114,7 +115,7 @@ Result<void> ClassDirectoryReader::forEach(const std::function<void(std::shared_
     });
     refusals.say(log_, directory_);
     metHidden_ = refusals.isHidden();
-    // What this process could not look at may be a container. Taken for none, it would get a double.
+    // An entry that this process could not look at may be a container. Taken for none, it would get a double.
     if (const auto shortage = refusals.shortage())
         return failed(*shortage);
     for (auto& record : records)

@@ -3,7 +3,7 @@
 //
 // Reading is one open, one fstat, one read and one close an entry. In a large directory a second thread takes every
 // other stretch of entries: when the directory is not in memory, two reads are under way at the disk instead of one,
-// and when it is, two processors parse. What is found is handed over in the directory's order all the same, so that of
+// and when it is, two processors parse. Each record is handed over in the directory's order all the same, so that of
 // two containers with one identifier the later listed counts.
 #pragma once
 

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What a container of each class looks like inside: its standard subdirectories, their mode and owner.
+// The inside of a container of each class: its standard subdirectories, their mode and owner.
 #pragma once
 
 #include "base/ContainerClass.h"

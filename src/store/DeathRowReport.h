@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// What moves to death row and deletion passes share: what keeps a pass from what is still being moved, and what passes
-// could not remove, for the status and to be tried again.
+// The state that moves to death row and deletion passes share: what keeps a pass from what is still being moved, and
+// what passes could not remove, for the status and to be tried again.
 //
 // A pass writes it, on the death-row queue; anybody reads it.
 #pragma once

@@ -18,8 +18,8 @@ bool givesNothing(const plist::Value* value) {
            !std::ranges::all_of(*array, [](const plist::Value& element) { return element.asString(); });
 }
 
-/// What an entry of the map lists for this type, whatever it is. Who is handed a group counts, and so does who lists it
-/// in a list that is not handed out.
+/// The list that an entry of the map has for this type, whatever it is. An identifier that is handed a group counts,
+/// and so does one that lists it in a list that is not handed out.
 std::vector<const plist::Value*> groupsIn(const plist::Value& entry, GroupType type) {
     std::vector<const plist::Value*> lists;
     const auto add = [&](const plist::Value* value) {

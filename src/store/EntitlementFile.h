@@ -54,7 +54,8 @@ enum class GroupType : std::int32_t { application = 0, system = 1 };
 /// Group identifier to the identifiers whose entitlements list it, one for each time that they do: as many as there
 /// are references.
 using GroupReferences = std::map<std::string, std::vector<std::string>, std::less<>>;
-/// Who refers to which group, as deletions count it. `log` says which lists do not count; nullptr: nobody is told.
+/// The identifiers that refer to each group, as deletions count them. `log` says which lists do not count; nullptr:
+/// nobody is told.
 [[nodiscard]] GroupReferences groupReferencesIn(const plist::Dictionary& map, GroupType type, const Log* log);
 
 } // namespace zor

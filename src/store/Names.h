@@ -15,7 +15,7 @@ inline constexpr std::string_view rootHome = "/private/var/root";
 inline constexpr std::string_view brevadHome = "/private/var/brevad";
 inline constexpr std::string_view sharedContainers = "/private/var/containers";
 inline constexpr std::string_view temporary = "/tmp";
-/// Where an older system kept the bundle containers too.
+/// The place where an older system kept the bundle containers too.
 inline constexpr std::string_view formerContainers = "/private/var/mobile/Containers";
 
 // Below a home.
@@ -43,7 +43,7 @@ inline constexpr const char* containerTemporary = "tmp";
 
 /// In the library directory: what each identifier is entitled to.
 inline constexpr const char* entitlementFile = "zor_entitlements.plist";
-/// What an entitlement file that cannot be read is renamed to; its presence stops every pass that deletes on its word.
+/// The name that an entitlement file gets that cannot be read; its presence stops every pass that deletes on its word.
 inline constexpr const char* unreadableEntitlementFile = "zor_entitlements.plist.unreadable";
 
 /// In the library directory: what has been migrated, once for the device.

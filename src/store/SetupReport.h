@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the setup of this launch does: each pass inside its own exception boundary, with its time and how many items it
+// The work of this launch's setup: each pass inside its own exception boundary, with its time and how many items it
 // changed, for the status; and between items, a word to whoever waits for the daemon, and a look whether it is to end.
 //
 // Used by the thread that starts the daemon, before anything is served; passes() is read afterwards.

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// How much clients may leave behind in the daemon's memory, and how a listing is cut into pages. What is left behind is
-// found again at the next start, so nothing of it may grow without bound.
+// How much clients may leave behind in the daemon's memory, and how a listing is cut into pages. Everything left behind
+// is found again at the next start, so nothing of it may grow without bound.
 //
 // Shares count by the user whose containers they are, and bind every client but the owners of the root: users share
 // what belongs to the bundles' and the system's owner, and the installer, an owner of the root, is not kept out by

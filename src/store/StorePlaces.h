@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// Where everything of the store lies below a system root. Paths are put together here and nothing else: nothing is
-// made, nothing is looked at. Who makes the directories is ZORGlobalConfiguration; who only looks needs no more than
+// The places of everything in the store, below a system root. Paths are put together here and nothing else: nothing is
+// made, nothing is looked at. ZORGlobalConfiguration makes the directories; a reader that only looks needs no more than
 // this.
 //
 // Immutable after it is made; any thread.
@@ -40,16 +40,16 @@ public:
     [[nodiscard]] FileURL replaceDirectory() const;
     [[nodiscard]] FileURL bundleDirectory() const;
     [[nodiscard]] FileURL entitlementFile() const;
-    /// What an entitlement file that cannot be read is renamed to.
+    /// The name that an entitlement file gets that cannot be read.
     [[nodiscard]] FileURL unreadableEntitlementFile() const;
-    /// Where an older system kept bundle containers, and those of one class.
+    /// The place where an older system kept bundle containers, and that of one class.
     [[nodiscard]] FileURL formerBundleDirectory() const;
     [[nodiscard]] FileURL formerBundleDirectory(ContainerClass containerClass) const;
 
     /// Directories at or above all containers but those of mobile users.
     [[nodiscard]] std::vector<FileURL> placesOfSharedContainers() const;
 
-    // Of a mobile user with this home.
+    // Places of a mobile user with this home.
     [[nodiscard]] static FileURL userBaseDirectory(const FileURL& home);
     [[nodiscard]] static FileURL userTransientDirectory(const FileURL& home);
 

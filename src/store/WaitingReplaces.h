@@ -3,7 +3,7 @@
 // failed, or the sync behind a move, or the reading of the journal. The old container of each may still come back from
 // staging, at a later try or at the next launch.
 //
-// Ordinarily there are none, and a look costs one load. One mutex; any thread. What is kept here ends with the process:
+// Ordinarily there are none, and a look costs one load. One mutex; any thread. All of it ends with the process:
 // the next launch reads the journals.
 #pragma once
 

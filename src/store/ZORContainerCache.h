@@ -77,8 +77,8 @@ public:
 
     /// Forgets every class cache; each is built anew when it is next needed.
     void dropAll() ZOR_EXCLUDES(cacheLock_);
-    /// What a user has, in classes of every kind, transient ones included. The first time that a user is asked for,
-    /// every class cache of the user's is built whose directory is there; later this is a sum over them. While the
+    /// The containers of a user, in classes of every kind, transient ones included. The first time that a user is asked
+    /// for, every class cache of the user's is built whose directory is there; later this is a sum over them. While the
     /// user's home is missing that comes again.
     struct Held {
         std::size_t containers = 0;

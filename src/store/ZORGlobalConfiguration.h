@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// Where everything lies that does not belong to one mobile user, and which class directory a container belongs to.
+// The places of everything that does not belong to one mobile user, and the class directory of each container.
 //
 // A directory getter makes its directory on every call, so one that was moved away is there again at the next; it logs
 // when that fails and returns the place anyway. Whether a user may own a class is its callers' question.
@@ -53,7 +53,7 @@ public:
     FileURL deathrowDirectory();
     FileURL replaceDirectory();
     FileURL bundleDirectory();
-    /// Where an older system kept bundle containers, and those of one class; not made here.
+    /// The place where an older system kept bundle containers, and that of one class; not made here.
     [[nodiscard]] FileURL formerBundleDirectory() const { return places_.formerBundleDirectory(); }
     [[nodiscard]] FileURL formerBundleDirectory(ContainerClass containerClass) const {
         return places_.formerBundleDirectory(containerClass);
@@ -83,7 +83,7 @@ public:
     /// Its place, made or not; nothing is made here.
     std::optional<FileURL> placeOfClass(std::uint32_t userId, ContainerClass containerClass, bool transient);
 
-    /// What a user keeps in an application's data container.
+    /// The layout of an application's data container.
     [[nodiscard]] static const std::array<std::string_view, 4>& appUserDataItemNames();
 
 private:

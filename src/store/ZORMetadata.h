@@ -24,7 +24,7 @@
 
 namespace zor {
 
-/// Where a container lies: a directory that many share, and its own name in it.
+/// The place of a container: a directory that many share, and its own name in it.
 class ContainerPlace {
 public:
     ContainerPlace() = default;
@@ -97,7 +97,7 @@ private:
 
 enum class CheckClassPath { no, yes };
 
-/// What a metadata file fails to be, in the order in which it is looked at.
+/// The rules that a metadata file may break, in the order in which they are looked at.
 enum class MetadataRule { readable, user, identifier, uuid, containerClass, info, place };
 
 /// Why a metadata file is not believed.

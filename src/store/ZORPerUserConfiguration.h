@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
-// Where the containers of one mobile user lie. Getters never fail: they make their directory on every call, log when
-// they cannot, and return the place anyway. A home that is not there makes every place below it absent; the home itself
-// is never made, nor anything on the way to it.
+// The places of the containers of one mobile user. Getters never fail: they make their directory on every call, log
+// when they cannot, and return the place anyway. A home that is not there makes every place below it absent; the home
+// itself is never made, nor anything on the way to it.
 //
 // Its own recursive lock is held for a whole getter. Lock order: the global configuration's lock before this one.
 #pragma once
@@ -17,7 +17,7 @@
 
 namespace zor {
 
-/// A directory that a getter has made or found, and whether it may be used. What is open was judged.
+/// A directory that a getter has made or found, and whether it may be used. An open one was judged.
 struct UsableDirectory {
     FileURL url;
     Result<platform::FileDescriptor> opened;

@@ -53,7 +53,7 @@ public:
     [[nodiscard]] bool isWhole(ContainerClass containerClass) const;
 
     enum class NameOf : std::uint8_t { container, noContainer, unknown };
-    /// What a name in the class's directory says of what lies there.
+    /// The kinds of name in a class's directory.
     [[nodiscard]] NameOf judgeName(std::string_view name, ContainerClass containerClass) const;
 
 private:

@@ -22,7 +22,7 @@ struct ProcessContainers {
 };
 
 /// Packs what there is in its fixed order, and the status behind it: whether `success` holds and all could be packed.
-/// What does not fit is logged, and nothing but the status is packed after it.
+/// An answer that does not fit is logged, and nothing but the status is packed after it.
 void packProcessContainersReply(const Log& log, sb_packbuff& packbuff, const ProcessContainers& containers,
                                 bool success);
 

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the kernel asks for a process: whose containers, and which. Read from a packed buffer, each byte of which is
+// The kernel's question for a process: whose containers, and which. Read from a packed buffer, each byte of which is
 // taken for hostile.
 #pragma once
 
@@ -24,7 +24,7 @@ struct ProcessContainersRequest {
     std::optional<std::string> systemContainerIdentifier;
     std::vector<std::string> systemGroupIdentifiers;
 
-    /// Of the data container; nullptr when none is wanted.
+    /// The identifier of the data container; nullptr when none is wanted.
     [[nodiscard]] const std::string* dataContainerIdentifier() const {
         if (containerIdentifier)
             return &*containerIdentifier;

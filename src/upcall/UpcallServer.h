@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
-// Answers the kernel's upcall: which containers does a process have. What is missing is made.
+// Answers the kernel's upcall: which containers does a process have. A missing one is made.
 //
 // A request is answered whole or with a status that says no: when one of its containers cannot be had, no path is told,
-// though those that were made stay. What a reply with status 1 names is on the disk, as for any client. A stop in the
-// middle leaves the containers made so far, each whole.
+// though those that were made stay. A container that a reply with status 1 names is on the disk, as for any client. A
+// stop in the middle leaves the containers made so far, each whole.
 //
 // Runs on the main thread, one packet at a time; the lookups take their locks themselves. Keeps nothing between
 // packets. No packet can end the daemon: what is thrown ends at this class.

@@ -19,13 +19,13 @@ inline constexpr std::uint32_t processContainersMessageId = 322'514'900;
 /// A reply's id is that of its request and this.
 inline constexpr std::uint32_t replyIdOffset = 100;
 
-/// What the numbers at the start of a packet say of its size are those of the interface, not of the packet.
+/// The sizes that the numbers at the start of a packet tell are those of the interface, not of the packet.
 inline constexpr std::uint32_t requestTotalBytes = 52;
 inline constexpr std::uint32_t replyTotalBytesWithBuffer = 52;
 inline constexpr std::uint32_t replyTotalBytesWithoutBuffer = 36;
 inline constexpr std::uint32_t outOfLineDescriptor = 1;
 
-// Where the fields of a packet are. The buffer is what follows the header, to the packet's end.
+// The places of a packet's fields. The buffer is what follows the header, to the packet's end.
 struct RequestOffset {
     static constexpr std::size_t totalBytes = 0;
     static constexpr std::size_t messageId = 4;
