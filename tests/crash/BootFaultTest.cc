@@ -1,11 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // The first launch of a boot over a device that an older system left, with each of its calls failing, the daemon ending
 // at each, and the power going after each.
-#include "crash/StoreWorld.h"
+#include "crash/Scenarios.h"
 #include "operations/ZOREntitlementMapping.h"
-#include "plist/Binary.h"
 #include "support/FaultLoop.h"
-#include "support/Files.h"
 #include "support/PowerCut.h"
 #include "support/ProcessResources.h"
 
@@ -24,44 +22,18 @@ constexpr const char* bundleUuid = "11111111-0000-4000-8000-000000000000";
 constexpr const char* wellknownUuid = "22222222-0000-4000-8000-000000000000";
 constexpr const char* dataUuid = "33333333-0000-4000-8000-000000000000";
 constexpr const char* unentitledUuid = "44444444-0000-4000-8000-000000000000";
-constexpr const char* metadataName = ".com.veltra.zorvane.metadata.plist";
 
-struct Kind {
-    std::uint64_t number;
-    std::uint32_t user;
-    std::uint32_t owner;
-    std::vector<const char*> inside;
-    mode_t insideMode;
-};
-const Kind bundle = {1, 501, 501, {}, 0};
-const Kind data = {2, 501, 501, {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp"}, 0755};
-const Kind system = {12, 499, 0, {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp"}, 0777};
-
-void give(const files::path& path, std::uint32_t owner) {
-    if (::geteuid() == 0)
-        checked(::lchown(path.c_str(), owner, owner), "chown " + path.string());
-}
-
-void put(const files::path& path, const Kind& kind, const std::string& identifier, const plist::Dictionary& info = {}) {
-    files::create_directories(path);
-    for (files::path level = path; level.filename() != "var"; level = level.parent_path())
-        give(level, level == path || kind.user == 501 ? kind.owner : 0);
-    for (const char* inside : kind.inside) {
-        files::create_directory(path / inside);
-        files::permissions(path / inside, static_cast<files::perms>(kind.insideMode));
-        give(path / inside, kind.owner);
-    }
-    plist::Dictionary metadata{{"ZORMetadataContentClass", kind.number},
-                               {"ZORMetadataPersona", kind.user},
-                               {"ZORMetadataIdentifier", identifier},
-                               {"ZORMetadataUUID", path.filename().string()}};
-    if (!info.empty())
-        metadata.set("ZORMetadataInfo", info);
-    const auto bytes = plist::writeBinary(metadata).value();
-    std::ofstream(path / metadataName, std::ios::binary)
-        .write(reinterpret_cast<const char*>(bytes.data()), static_cast<std::streamsize>(bytes.size()));
-    std::ofstream(path / "content") << identifier;
-    give(path / "content", kind.owner);
+/// A container as an older system left it, with a file that tells it from others.
+void put(const test::World& world, const std::string& path, const plist::Dictionary& metadata,
+         const std::vector<const char*>& inside = {}, mode_t insideMode = 0755) {
+    world.putContainer(path, metadata);
+    for (const char* directory : inside)
+        world.makeDirectories(path + "/" + directory, {}, insideMode);
+    world.write(path + "/content", *metadata.string("ZORMetadataIdentifier"));
+    struct stat top{};
+    must(::stat(world.path(path).c_str(), &top) == 0 &&
+             ::lchown(world.path(path + "/content").c_str(), top.st_uid, top.st_gid) == 0,
+         "no content");
 }
 
 std::string textOf(const files::path& path) {
@@ -77,14 +49,21 @@ struct OldDevice {
         const std::string key(entitlementKeys::systemContainer);
         EXPECT_TRUE(device.daemon->entitlements()._setEntitlementDictionaryValues({plist::Dictionary{{key, true}}},
                                                                                   {"com.veltra.settingsd"}));
+        const test::World& world = device.daemon->world;
+        const std::vector<const char*> inData = {"Documents", "Library", "Library/Caches", "Library/Preferences",
+                                                 "tmp"};
+        plist::Dictionary data = test::metadataOf(2, mobileUser, "com.example.data", dataUuid);
+        data.set("ZORMetadataInfo",
+                 plist::Dictionary{{"com.veltra.Brevance.GroupContainerIDs", plist::Array{"group.old"}}});
+        put(world, std::string(test::mobileContainers) + "/Bundle/Application/" + bundleUuid,
+            test::metadataOf(1, mobileUser, "com.example.bundle", bundleUuid));
+        put(world, test::applications + "/" + dataUuid, data, inData);
+        put(world, test::applications + "/Junk", test::metadataOf(2, mobileUser, "junk"), inData);
+        const std::string system = std::string(test::sharedPath) + "/Data/System/";
+        for (const auto& [uuid, identifier] :
+             {std::pair(wellknownUuid, "com.veltra.settingsd"), std::pair(unentitledUuid, "com.example.unentitled")})
+            put(world, system + uuid, test::metadataOf(12, systemUser, identifier, uuid), inData, 0777);
         device.daemon.reset();
-        const files::path var = device.root.path() + "/private/var";
-        put(var / "mobile/Containers/Bundle/Application" / bundleUuid, bundle, "com.example.bundle");
-        put(var / "mobile/Containers/Data/Application" / dataUuid, data, "com.example.data",
-            {{"com.veltra.Brevance.GroupContainerIDs", plist::Array{"group.old"}}});
-        put(var / "containers/Data/System" / wellknownUuid, system, "com.veltra.settingsd");
-        put(var / "containers/Data/System" / unentitledUuid, system, "com.example.unentitled");
-        put(var / "mobile/Containers/Data/Application/Junk", data, "junk");
         device.marker.forget();
     }
 
@@ -95,7 +74,7 @@ struct OldDevice {
 
 std::uint64_t changesOf(StoreDaemon& daemon) {
     std::uint64_t changes = 0;
-    for (const auto& pass : daemon.composition().store().setup.passes())
+    for (const auto& pass : daemon.world.services().store().setup.passes())
         changes += pass.changed;
     return changes;
 }
@@ -133,7 +112,7 @@ Bundle expectationAfter(const OldDevice& old, const FaultOutcome& outcome) {
     const bool done = files::exists(var / "root/Library/Zorvane/zor_bundle_migration_complete.plist");
     const files::path place = var / "containers/Bundle/Application" / bundleUuid;
     struct stat status{};
-    const bool asItWas = ::lstat(place.c_str(), &status) == 0 && status.st_uid == bundle.owner;
+    const bool asItWas = ::lstat(place.c_str(), &status) == 0 && status.st_uid == mobileUser;
     const bool oneError = !outcome.stopped && outcome.fault.span == FaultSpan::once;
     return done && asItWas && oneError ? Bundle::inPlace : Bundle::known;
 }
@@ -141,7 +120,7 @@ Bundle expectationAfter(const OldDevice& old, const FaultOutcome& outcome) {
 /// Of a boot that finishes the migration, and one that finds nothing to do.
 std::string judgeNextBoots(const std::string& root, Bundle expected) {
     platform::LinuxDisk disk{platform::Syncs::off};
-    MemoryBootMarker marker;
+    test::FlagBootMarker marker;
     for (const bool isLast : {false, true}) {
         marker.forget();
         StoreDaemon daemon(root, marker, disk, journalEverywhere);

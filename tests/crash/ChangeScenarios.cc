@@ -132,6 +132,10 @@ Scenario replacement(const std::string& name, OldOne kind) {
         });
     if (kind == OldOne::none)
         scenario.prepare = makeFresh;
+    scenario.afterOneError = [=](const std::string& root) -> std::string {
+        const Changed waiting = look(root, true);
+        return waiting.content == "missing" || waiting.uuid == fresh->uuid ? "" : "the new one has the old one's UUID";
+    };
     return scenario;
 }
 
@@ -143,7 +147,7 @@ struct StoppedReplace {
 StoppedReplace stopAfterFirstMove(Device& device, const Acknowledged& old) {
     const Acknowledged fresh = makeWithContent(device, true, "new");
     const UUID uuid = UUID::random();
-    StoreServices& services = device.daemon->composition().store();
+    StoreServices& services = device.daemon->world.services().store();
     const FileURL oldUrl = FileURL::directory(old.path);
     const ReplaceJournal journal{.oldUrl = oldUrl,
                                  .newUrl = FileURL::directory(fresh.path),
@@ -180,7 +184,7 @@ Scenario recoveryOfADoneReplace() {
         "recovery of a replace that was done",
         [=](Device& device, const Acknowledged& old) { *stopped = stopAfterFirstMove(device, old); },
         [=](Device& device, const Acknowledged&) {
-            if (device.daemon->composition().store().fileManager.moveItemAtURL(stopped->newUrl, stopped->destUrl))
+            if (device.daemon->world.services().store().fileManager.moveItemAtURL(stopped->newUrl, stopped->destUrl))
                 device.daemon->launch();
             return true;
         },

@@ -151,7 +151,7 @@ Scenario firstUseOfGroups() {
             [](Device& device) { mustRegister(device, app, entitlements({"group.a", "group.b"}, {"systemgroup.a"})); },
         .act =
             [requests](Device& device) {
-                Composition& composition = device.daemon->composition();
+                Composition& composition = device.daemon->world.services();
                 for (const Request& request : requests) {
                     const auto paths = composition.groups().groupContainerPathsForUser(
                         request.userId, *composition.sharedClientConnection(), &app);

@@ -3,8 +3,7 @@
 
 #include "support/Files.h"
 #include "support/LongRun.h"
-#include "upcall/packbuff/Packbuff.h"
-#include "upcall/packbuff/UpcallMessage.h"
+#include "world/UpcallPackets.h"
 
 #include <algorithm>
 #include <functional>
@@ -57,13 +56,18 @@ Scenario scenarioOf(const std::string& name, std::function<void(Device&)> prepar
 Scenario creation(const std::string& name, ContainerClass containerClass, std::uint32_t user,
                   const std::string& identifier = "com.example.new") {
     const Request request{identifier, containerClass, user};
-    return scenarioOf(
+    Scenario scenario = scenarioOf(
         "creation of a " + name + " container",
         [request](Device& device) {
             device.create({"com.example.first", ContainerClass::dataApplication, mobileUser});
             entitle(device, {request});
         },
         [request](Device& device) { device.create(request); }, {request});
+    scenario.afterOneError = [](const std::string& root) -> std::string {
+        const auto staged = judgeStore(readTree(root, {"run"}), Transients::ignored).staging;
+        return staged.empty() ? "" : staged.front() + " is left in staging";
+    };
+    return scenario;
 }
 
 Scenario transientAgain() {
@@ -159,46 +163,24 @@ const std::vector<UpcallItem>& upcallItems() {
     return items;
 }
 
-/// The answers are asked for without a socket. The platform's own port has no room for replies before it listens.
-class NoUpcallPort final : public platform::UpcallPort {
-public:
-    int checkIn() override { return 0; }
-    [[nodiscard]] const char* checkInCallName() const override { return "none"; }
-    bool serve(platform::RunLoop&, std::function<std::vector<std::uint8_t>(const platform::UpcallPacket&)>) override {
-        return true;
-    }
-    [[nodiscard]] const char* sourceCallName() const override { return "none"; }
-};
-
 /// Promises what a reply with status 1 names.
 void makeUpcall(Device& device) {
-    const PackbuffPointer packbuff(sb_packbuff_new(256));
-    sb_packbuff_pack_uint32(packbuff.get(), upcall::CM_KERN_REQUEST_PERSONA_ID, mobileUser);
+    test::Items items;
+    items.number(upcall::CM_KERN_REQUEST_PERSONA_ID, mobileUser);
     for (const auto& [request, asked, answered] : upcallItems())
-        sb_packbuff_pack_string(packbuff.get(), asked, request.identifier.c_str(),
-                                static_cast<std::uint32_t>(request.identifier.size()));
-    const auto packet = upcall::encodeRequest({sb_packbuff_get_bytes(packbuff.get()), packbuff->bytes_used});
-    const NoUpcallPort port;
-    UpcallServer server(device.daemon->composition().store(), port);
-    const auto answer = server.answer({.bytes = packet, .senderPid = 0, .senderUserId = 0});
-    const auto reply = upcall::decodeReply(answer);
-    must(reply && reply->returnCode == upcall::ReturnCode::success && !reply->buffer.empty(), "no answer to an upcall");
-    std::vector<std::uint8_t> buffer(reply->buffer.begin(), reply->buffer.end());
-    const PackbuffPointer reader(sb_packbuff_init_with_buffer(buffer.data(), buffer.size(), true, packbuffDeallocNone));
-    std::vector<std::string> paths;
-    for (std::uint16_t valueType = 0;;) {
-        must(sb_packbuff_get_item_value_type(reader.get(), &valueType) != 0, "a reply without a status");
-        if (valueType == upcall::CM_KERN_REPLY_STATUS)
-            break;
-        const char* const text = sb_packbuff_unpack_string(reader.get(), nullptr, nullptr);
-        must(text != nullptr, "an item of a reply that is no string");
-        if (paths.size() < upcallItems().size() && valueType == upcallItems()[paths.size()].answered)
-            paths.emplace_back(text);
-    }
-    if (sb_packbuff_unpack_uint32(reader.get(), nullptr) != 1)
+        items.string(asked, request.identifier);
+    const test::ByteVector packet = items.packet();
+    const test::NoPort port;
+    UpcallServer server(device.daemon->world.services().store(), port);
+    const auto reply = test::replyIn(server.answer({.bytes = packet, .senderPid = 0, .senderUserId = 0}));
+    must(reply.returnCode == 0 && !reply.items.empty(), "no answer to an upcall");
+    if (reply.text(upcall::CM_KERN_REPLY_STATUS) != "1")
         return;
-    for (std::size_t i = 0; i < upcallItems().size(); ++i)
-        device.promise(upcallItems()[i].request, paths.at(i));
+    std::size_t told = 0;
+    for (const auto& [type, text] : reply.items)
+        if (told < upcallItems().size() && type == upcallItems()[told].answered)
+            device.promise(upcallItems()[told++].request, text);
+    must(told == upcallItems().size(), "a reply that names too few");
 }
 
 Scenario upcallOfSix() {

@@ -41,6 +41,8 @@ struct Scenario {
     [[nodiscard]] std::string withoutDamage(const std::string& complaint) const {
         return isDamage && isDamage(complaint) ? "" : complaint;
     }
+    /// Judges what an operation must have put right itself when one call of it failed; the daemon still runs.
+    std::function<std::string(const std::string& root)> afterOneError;
     /// Judges what only this scenario knows of; after a restart. `acted` when act came to its end without an error.
     std::function<std::string(const std::string& root, bool acted)> also;
 };

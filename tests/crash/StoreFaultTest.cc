@@ -40,11 +40,16 @@ void act(FaultWorld& world, const Scenario& scenario) {
     scenario.act(device);
 }
 
-std::string judgeRunningDaemon(Device& device, const Scenario& scenario) {
+std::string judgeRunningDaemon(Device& device, const Scenario& scenario, const FaultOutcome& outcome) {
     const StoreFindings findings = judgeStore(readTree(device.root.path(), {"run"}), Transients::judged);
     if (const std::string complaint = scenario.withoutDamage(findings.complaint); !complaint.empty())
         return "as the error left it: " + complaint;
-    if (device.daemon->composition().locks().identifiersInUse() != 0)
+    if (outcome.fault.span == FaultSpan::once && device.home == Home::onRoot) {
+        if (std::string complaint = scenario.afterOneError ? scenario.afterOneError(device.root.path()) : "";
+            !complaint.empty())
+            return "after one error: " + complaint;
+    }
+    if (device.daemon->world.services().locks().identifiersInUse() != 0)
         return "an identifier is still locked";
     if (!scenario.goesOnAfterErrors)
         return "";
@@ -60,7 +65,7 @@ std::string judgeRunningDaemon(Device& device, const Scenario& scenario) {
 std::string judge(FaultWorld& world, const Scenario& scenario, const FaultOutcome& outcome) {
     Device& device = world.device;
     if (!outcome.stopped && device.daemon) {
-        if (std::string complaint = judgeRunningDaemon(device, scenario); !complaint.empty())
+        if (std::string complaint = judgeRunningDaemon(device, scenario, outcome); !complaint.empty())
             return complaint;
     }
     device.daemon.reset();
@@ -110,7 +115,7 @@ TEST_P(StoreFaultTest, StandsEveryFault) {
 class HomeFaultTest : public ::testing::TestWithParam<Scenario> {};
 
 TEST_P(HomeFaultTest, StandsEveryFaultBetweenFileSystems) {
-    if (!homesCanBeMounted())
+    if (!test::MountedHome::canBe())
         GTEST_SKIP() << "skipped: only root may mount a home";
     for (const Fault& fault : faults) {
         if (fault.kind != FaultKind::exit && fault.error != EACCES)

@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "crash/Scenarios.h"
+#include "support/LongRun.h"
 #include "support/PowerCut.h"
 
 #include <gtest/gtest.h>
@@ -9,7 +10,9 @@ namespace {
 
 void loopOverCuts(const Scenario& scenario, DiskModel model, Home home = Home::onRoot) {
     // Two file systems have the product of each one's states.
-    const std::size_t singleChangesMax = home == Home::mounted ? 4 : 24;
+    const bool two = home == Home::mounted;
+    const std::size_t singleChangesMax = (two ? 4 : 24) / (isLongRun() ? 1 : 2);
+    const std::size_t randomStates = isLongRun() ? 8 : two ? 2 : 4;
     const fs::Durability::Probe probe = model == DiskModel::unordered ? noOrderAnywhere : journalEverywhere;
     platform::LinuxDisk linuxDisk;
     Device device("/dev/shm", home);
@@ -28,22 +31,26 @@ void loopOverCuts(const Scenario& scenario, DiskModel model, Home home = Home::o
     const DiskLog log = disk.log();
     ASSERT_GT(log.operations.size(), before.operations.size());
 
-    const LoopReport report = forEachPowerCut(
-        log, {.model = model, .singleChangesMax = singleChangesMax, .firstCut = before.operations.size()},
-        [&](const PowerCutState& state, const std::string& root) {
-            const bool acted = state.marksPassed > 1;
-            std::vector<Acknowledged> promised;
-            for (std::size_t i = 0; i < (acted ? device.promised.size() : promisedBefore); ++i) {
-                promised.push_back(device.promised[i]);
-                promised.back().path.replace(0, device.root.path().size(), root);
-            }
-            MemoryBootMarker marker;
-            std::string complaint =
-                scenario.withoutDamage(judgeAfterRestart(root, marker, probe, promised, scenario.requests));
-            if (complaint.empty() && scenario.also)
-                complaint = scenario.also(root, acted);
-            return complaint;
-        });
+    const LoopReport report =
+        forEachPowerCut(log,
+                        {.model = model,
+                         .randomStatesPerCut = randomStates,
+                         .singleChangesMax = singleChangesMax,
+                         .firstCut = before.operations.size()},
+                        [&](const PowerCutState& state, const std::string& root) {
+                            const bool acted = state.marksPassed > 1;
+                            std::vector<Acknowledged> promised;
+                            for (std::size_t i = 0; i < (acted ? device.promised.size() : promisedBefore); ++i) {
+                                promised.push_back(device.promised[i]);
+                                promised.back().path.replace(0, device.root.path().size(), root);
+                            }
+                            test::FlagBootMarker marker;
+                            std::string complaint = scenario.withoutDamage(
+                                judgeAfterRestart(root, marker, probe, promised, scenario.requests));
+                            if (complaint.empty() && scenario.also)
+                                complaint = scenario.also(root, acted);
+                            return complaint;
+                        });
     EXPECT_EQ(report.complaint, "");
     EXPECT_GT(scenario.callsPerStateMax * report.examined, log.operations.size() - before.operations.size());
 }
@@ -64,7 +71,7 @@ TEST_P(StorePowerCutTest, StandsEveryCutWithoutOrder) {
 class HomePowerCutTest : public ::testing::TestWithParam<Scenario> {};
 
 TEST_P(HomePowerCutTest, StandsEveryCutBetweenFileSystems) {
-    if (!homesCanBeMounted())
+    if (!test::MountedHome::canBe())
         GTEST_SKIP() << "skipped: only root may mount a home";
     loopOverCuts(GetParam(), DiskModel::orderedJournal, Home::mounted);
     loopOverCuts(GetParam(), DiskModel::unordered, Home::mounted);

@@ -3,53 +3,17 @@
 
 #include "check/StoreCheck.h"
 #include "daemon/Daemon.h"
-#include "support/Files.h"
 #include "support/ProcessResources.h"
 
 #include <algorithm>
 #include <fstream>
-#include <sched.h>
 #include <sstream>
 #include <stdexcept>
-#include <sys/mount.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 namespace zor::support {
 
 namespace {
-
-platform::Platform withRoles(platform::LinuxPlatform& linuxPlatform, platform::Disk& disk, platform::PlatformLog& log,
-                             platform::FileProtectionClass& protection, platform::SandboxUserState& sandbox,
-                             platform::BootMarker& marker, platform::WorkQueue& queue) {
-    const platform::Platform real = linuxPlatform.roles();
-    return {.root = real.root,
-            .disk = disk,
-            .log = log,
-            .internalBuild = real.internalBuild,
-            .systemVersion = real.systemVersion,
-            .passwords = real.passwords,
-            .lockState = real.lockState,
-            .protection = protection,
-            .sandbox = sandbox,
-            .assertions = real.assertions,
-            .crash = real.crash,
-            .bootMarker = marker,
-            .transactions = real.transactions,
-            .deathRowQueue = queue,
-            .lockStateQueue = queue,
-            .runLoop = real.runLoop,
-            .peers = real.peers,
-            .listener = real.listener,
-            .upcallPort = real.upcallPort};
-}
-
-std::unique_ptr<platform::LinuxPlatform> openPlatform(const std::string& root) {
-    auto opened = platform::LinuxPlatform::open({.rootDirectory = root});
-    if (!opened)
-        throw std::runtime_error(opened.error());
-    return std::move(*opened);
-}
 
 /// What must hold of a store at rest.
 std::string judgeAtRest(const std::string& root, const std::vector<Acknowledged>& promised, Leftovers leftovers) {
@@ -98,7 +62,7 @@ std::string judgeRequests(StoreDaemon& daemon, const std::string& root, std::vec
             return request.identifier + " was found and then made again";
         add(promised, *created.acknowledged);
     }
-    if (daemon.composition().locks().identifiersInUse() != 0)
+    if (daemon.world.services().locks().identifiersInUse() != 0)
         return "an identifier is still locked";
     return judgeAtRest(root, promised, leftovers);
 }
@@ -124,23 +88,11 @@ std::string judgeByCheck(const std::string& root, const platform::BootMarker& ma
 
 std::string StoreDaemon::log() {
     constexpr std::size_t linesMax = 200;
-    const std::vector<LogLine> lines = log_.take();
+    const std::vector<LogLine> lines = world.log.take();
     std::ostringstream text;
     for (std::size_t i = lines.size() > linesMax ? lines.size() - linesMax : 0; i < lines.size(); ++i)
         text << "\n    " << lines[i];
     return text.str();
-}
-
-void furnishRoot(const std::string& root) {
-    const platform::FileDescriptor top = openDirectory(root);
-    for (const char* directory : {"etc", "tmp", "private", "private/var", "private/var/mobile", "private/var/brevad"})
-        makeDirectory(top.get(), directory);
-    checked(::fchmod(top.get(), 0755), "chmod");
-    if (::geteuid() == 0) {
-        checked(::fchownat(top.get(), "private/var/mobile", 501, 501, 0), "chown");
-        checked(::fchownat(top.get(), "private/var/brevad", 33, 33, 0), "chown");
-    }
-    std::ofstream(root + "/etc/passwd") << "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
 }
 
 void add(std::vector<Acknowledged>& promised, const Acknowledged& promise) {
@@ -158,21 +110,8 @@ fs::Ordering noOrderAnywhere(int) {
     return fs::Ordering::none;
 }
 
-StoreDaemon::StoreDaemon(const std::string& root, platform::BootMarker& marker, platform::Disk& disk,
-                         fs::Durability::Probe probe)
-    : root_(root), platform_(openPlatform(root)), protection_(disk, platform_->roles().lockState),
-      sandbox_(platform_->root(), disk),
-      composition_(std::make_unique<Composition>(
-          withRoles(*platform_, disk, log_, protection_, sandbox_, marker, queue_), probe)) {
-    (void)composition_->store(); // reads the entitlement file, as a start does
-}
-
-StoreDaemon::~StoreDaemon() {
-    platform_->finish();
-}
-
 void StoreDaemon::launch() {
-    Daemon(*composition_, {}).setUp();
+    Daemon(world.services(), {}).setUp();
 }
 
 StoreDaemon::Answer StoreDaemon::ask(const Request& request, bool createIfNecessary) {
@@ -184,24 +123,12 @@ StoreDaemon::Answer StoreDaemon::ask(const Request& request, bool createIfNecess
     return {.acknowledged = Acknowledged{request, found->path, found->uuid.string()}};
 }
 
-bool homesCanBeMounted() {
-    static const bool can =
-        ::unshare(CLONE_NEWNS) == 0 && ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0;
-    return can;
-}
-
 Device::Device(const std::string& parent, Home whereHome) : root(parent), home(whereHome) {
-    furnishRoot(root.path());
-    const std::string path = root.path() + "/private/var/mobile";
-    if (home == Home::mounted &&
-        (!homesCanBeMounted() || ::mount("home", path.c_str(), "tmpfs", 0, "mode=0755,uid=501,gid=501") != 0))
+    test::furnish(root.path());
+    // Each user takes the passes of a boot longer.
+    std::ofstream(root.path() + "/etc/passwd") << "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
+    if (home == Home::mounted && !mountedHome.emplace(root.path()).mounted())
         throw std::runtime_error("cannot mount a home");
-}
-
-Device::~Device() {
-    daemon.reset();
-    if (home == Home::mounted)
-        ::umount2((root.path() + "/private/var/mobile").c_str(), MNT_DETACH);
 }
 
 void Device::start(platform::Disk& onDisk, fs::Durability::Probe probe) {

@@ -1,48 +1,15 @@
 // SPDX-License-Identifier: Apache-2.0
-// A device with a store on it, and daemons that come and go on it: real roles and operations over a disk that the test
-// gives.
-//
-// The death-row queue runs its jobs at once, on the thread that queues them: the earliest that a pass can come, and a
-// stop in a pass reaches the test. One thread; one daemon at a time on a root.
+// A device with a store on it, and daemons that come and go on it: worlds over a disk that the test gives. One thread;
+// one daemon at a time on a root.
 #pragma once
 
-#include "daemon/Composition.h"
-#include "daemon/LinuxPlatform.h"
-#include "os/LinuxDisk.h"
-#include "support/RecordingLog.h"
 #include "support/StoreJudge.h"
+#include "world/World.h"
 
 #include <memory>
 #include <optional>
 
 namespace zor::support {
-
-/// What a boot keeps in memory.
-class MemoryBootMarker final : public platform::BootMarker {
-public:
-    explicit MemoryBootMarker(bool present = false) : present_(present) {}
-    [[nodiscard]] State look() const override { return {.present = present_, .foreign = false}; }
-    int make() override {
-        present_ = true;
-        return 0;
-    }
-    void forget() override { present_ = false; }
-    [[nodiscard]] std::string name() const override { return "memory"; }
-
-private:
-    bool present_;
-};
-
-class ImmediateQueue final : public platform::WorkQueue {
-public:
-    bool start() override { return true; }
-    void async(std::function<void()> job) override { job(); }
-    void suspend() override {}
-    void resume() override {}
-};
-
-/// A tree with what the daemon expects to find: the password file, homes, and the system's directories.
-void furnishRoot(const std::string& root);
 
 /// How a file system on which the store is told to lie keeps order.
 fs::Ordering journalEverywhere(int fd);
@@ -66,9 +33,10 @@ void add(std::vector<Acknowledged>& promised, const Acknowledged& promise);
 class StoreDaemon {
 public:
     StoreDaemon(const std::string& root, platform::BootMarker& marker, platform::Disk& disk,
-                fs::Durability::Probe probe);
-    ~StoreDaemon();
-
+                fs::Durability::Probe probe)
+        : world({.probe = probe, .root = root, .disk = &disk, .marker = &marker}) {
+        world.load(); // reads the entitlement file, as a start does
+    }
     /// The setup before the first client; of the boot too where the marker is missing.
     void launch();
     /// An error code, or what the client was told.
@@ -79,41 +47,31 @@ public:
     Answer create(const Request& request) { return ask(request, true); }
     Answer lookUp(const Request& request) { return ask(request, false); }
 
-    [[nodiscard]] Composition& composition() { return *composition_; }
-    [[nodiscard]] ZORClientConnection& client() { return *composition_->sharedClientConnection(); }
-    [[nodiscard]] ZOREntitlementMapping& entitlements() { return composition_->entitlements(); }
+    [[nodiscard]] ZORClientConnection& client() { return world.daemonsClient(); }
+    [[nodiscard]] ZOREntitlementMapping& entitlements() { return world.services().entitlements(); }
     /// Its latest lines since the last call, for a test that fails.
     [[nodiscard]] std::string log();
 
+    test::World world;
+
 private:
     Answer ask(const Request& request, bool createIfNecessary);
-
-    const std::string root_;
-    RecordingLog log_{logLevelNotice};
-    ImmediateQueue queue_;
-    std::unique_ptr<platform::LinuxPlatform> platform_;
-    platform::XattrProtectionClass protection_;
-    platform::LinkSandboxUserState sandbox_;
-    std::unique_ptr<Composition> composition_;
 };
 
 /// A daemon over a store that is at rest, to be asked what only a client can see.
 struct LaterDaemon {
-    explicit LaterDaemon(const std::string& root) : daemon(root, marker, disk, journalEverywhere) {}
-    MemoryBootMarker marker{true};
+    explicit LaterDaemon(const std::string& root) : daemon(root, marker, disk, journalEverywhere) { marker.make(); }
+    test::FlagBootMarker marker;
     platform::LinuxDisk disk{platform::Syncs::off};
     StoreDaemon daemon;
 };
 
-/// Where private/var/mobile lies: on the root's file system, or on one mounted there (in a mount namespace of this
-/// process, which only root may have).
+/// Where private/var/mobile lies: on the root's file system, or on one mounted there.
 enum class Home { onRoot, mounted };
-bool homesCanBeMounted();
 
 /// A device for one run of a fault loop: its root, and what its clients were promised.
 struct Device {
     explicit Device(const std::string& parent, Home home = Home::onRoot);
-    ~Device();
     void start(platform::Disk& onDisk, fs::Durability::Probe probe);
     /// Creates a container and notes it as promised. False when the daemon did not.
     bool create(const Request& request);
@@ -125,7 +83,8 @@ struct Device {
 
     TemporaryDirectory root;
     const Home home;
-    MemoryBootMarker marker;
+    std::optional<test::MountedHome> mountedHome;
+    test::FlagBootMarker marker;
     std::vector<Acknowledged> promised;
     /// A change that promises no container was acknowledged.
     bool acted = false;

@@ -134,7 +134,11 @@ const std::vector<Row>& rows() {
           {"OptionsDictionary", Dictionary{}, 11}}},
         {19, Asks::installer,
          place + Key{"Identifier", "app", 11, 21} + Key{"IsThirdParty", true, 1} + Key{"RetryIfLocked", true, 1} +
-             Key{"DataProtectionClass", 0, 1, 0, {{2, 38}, {5, 38}, {-1, 38}, {std::int64_t{1} << 32 | 2, 38}}}},
+             Key{"DataProtectionClass",
+                 0,
+                 1,
+                 0,
+                 {{2, 38}, {5, 38}, {-1, 38}, {256, 38}, {std::int64_t{1} << 32 | 2, 38}}}},
         {20, Asks::installer, known},
         {21, Asks::installer, known},
         {22, Asks::installer, {user, {"NumRetryCrashes", 0, 1}}},

@@ -13,7 +13,6 @@ using plist::Array;
 using plist::Dictionary;
 using support::DiskCall;
 using support::DiskCallInfo;
-using support::hasLine;
 
 const char* const byCaller = "com.veltra.Zorvane.EntitlementsRegisteredByCaller";
 
@@ -36,54 +35,24 @@ protected:
     }
 };
 
-// Goal: command 3 stages all of what it can read, and nothing without a list of identifiers. Method: lists of two.
-TEST_F(Shared, StagesLists) {
-    const FoundContainer a = world.make("a");
-    const FoundContainer b = world.make("b", ContainerClass::bundleApplication);
-    const auto stage = [&](plist::Value identifiers) {
-        return codeOf({{"Command", 3},
-                       {"ContainerClassesArray", Array{2, 1}},
-                       {"UUIDsArray", Array{makeContainer("a"), makeContainer("b", 1)}},
-                       {"UserIDsArray", Array{1, 33}},
-                       {"IdentifiersArray", std::move(identifiers)}});
-    };
-    EXPECT_EQ(stage("a"), 11U);
-    EXPECT_TRUE(
-        hasLine(world.log.take(), 3, "stageContainerForDelete", "Got non-Array input for the identifiers array"));
-    EXPECT_EQ(codeOf({{"Command", 3}}), 1U);
-    EXPECT_EQ(stage(Array{5, "b"}), 1U); // the first is skipped
-    EXPECT_TRUE(isThere(a.path) && !isThere(b.path));
-    EXPECT_EQ(stage(Array{"a", "b"}), 1U);
-    EXPECT_FALSE(isThere(a.path));
-}
-
 // Goal: a registration decides what commands 13, 14 and 16 tell. Method: an installer registers, clients ask.
 TEST_F(Shared, GroupPaths) {
     const Dictionary entitlements{{appGroups, Array{"g", "h"}}, {systemGroups, Array{"systemgroup.s", "bare"}}};
-    EXPECT_EQ(request({{"Command", 18}, {"Identifier", "app"}, {"Entitlements", entitlements}}),
-              (Dictionary{{"ReplyError", std::uint64_t{1}}}));
+    EXPECT_EQ(codeOf({{"Command", 18}, {"Identifier", "app"}, {"Entitlements", entitlements}}), 1U);
     EXPECT_EQ(request({{"Command", 14}, {"UserID", 1}, {"Identifier", "app"}}),
               (Dictionary{{"ReplyError", std::uint64_t{1}}, {"ReplyGroupIdentifiersArray", Array{"g", "h"}}}));
-    EXPECT_EQ(request({{"Command", 14}, {"UserID", 1}}),
-              (Dictionary{{"ReplyError", std::uint64_t{1}}, {"ReplyGroupIdentifiersArray", Array{}}}));
-
     asClient("app");
     const Dictionary appPaths = request({{"Command", 13}, {"UserID", 1}});
-    EXPECT_EQ(appPaths.size(), 2U);
     EXPECT_EQ(groupsIn(appPaths), (std::set<std::string>{"g", "h"}));
     const Dictionary systemPaths = request({{"Command", 16}});
     EXPECT_EQ(groupsIn(systemPaths), (std::set<std::string>{"systemgroup.s"}));
-    EXPECT_EQ(request({{"Command", 13}, {"UserID", 501}}), appPaths);
     asClient("other");
     EXPECT_EQ(request({{"Command", 13}, {"UserID", 1}, {"Identifier", "app"}}), appPaths);
     EXPECT_EQ(request({{"Command", 16}, {"Identifier", "app"}}), systemPaths);
     EXPECT_EQ(request({{"Command", 16}}),
               (Dictionary{{"ReplyError", std::uint64_t{1}}, {"ReplyGroupContainerDict", Dictionary{}}}));
-    asClient({});
-    EXPECT_EQ(request({{"Command", 13}, {"UserID", 1}}), (Dictionary{{"ReplyError", std::uint64_t{11}}}));
     asInstaller();
     EXPECT_EQ(codeOf({{"Command", 18}, {"Identifier", "app"}}), 1U);
-    EXPECT_TRUE(groupsIn(request({{"Command", 13}, {"UserID", 1}, {"Identifier", "app"}})).empty());
     EXPECT_FALSE(isThere(*appPaths.dictionary("ReplyGroupContainerDict")->string("g")));
 }
 
@@ -140,33 +109,29 @@ TEST_F(Shared, SystemContainersAndGroups) {
         Dictionary entitlements;
         Dictionary message;
         std::uint64_t code;
-        std::string said;
     };
-    const std::string noGroup = " is not entitled for system group identifier: ";
     const Row rows[] = {
-        {"its own", "owner", owner, container(nullptr), 1, ""},
-        {"not entitled to one", "plain", {}, container(nullptr), 55, ""},
-        {"another's, who is entitled", "plain", {}, container("owner"), 1, ""},
-        {"another's, who is not", "plain", {}, container("nobody"), 55, ""},
-        {"a well-known one", "plain", {}, container("com.veltra.settingsd"), 1, ""},
-        {"the next request", "plain", {}, container("nobody"), 55, ""},
-        {"its own of that name", "com.veltra.settingsd", {}, container(nullptr), 55, ""},
-        {"any, with the power", "lookup", powerful, container("nobody"), 1, ""},
-        {"nobody's", std::nullopt, {}, container(nullptr), 11, ""},
-        {"its group", "member", member, group("systemgroup.s"), 1, ""},
-        {"a group without its prefix", "member", member, group("bare"), 55, "member" + noGroup + "bare"},
-        {"a well-known group", "plain", {}, group("systemgroup.com.veltra.fonts"), 1, ""},
-        {"an unknown group", "plain", {}, group("systemgroup.s"), 55, "plain" + noGroup + "systemgroup.s"},
-        {"another's group", "plain", {}, groupOf("member", "systemgroup.s"), 55, "plain" + noGroup + "systemgroup.s"},
-        {"its group, as another", "member", member, groupOf("plain", "systemgroup.s"), 21,
-         "Did not find system group container with identifier: systemgroup.s for plain"},
-        {"no group", "member", member, group(5), 55, "member" + noGroup + "(null)"},
-        {"no client", std::nullopt, {}, group("systemgroup.s"), 55, "(null)" + noGroup + "systemgroup.s"},
+        {"its own", "owner", owner, container(nullptr), 1},
+        {"not entitled to one", "plain", {}, container(nullptr), 55},
+        {"another's, who is entitled", "plain", {}, container("owner"), 1},
+        {"another's, who is not", "plain", {}, container("nobody"), 55},
+        {"a well-known one", "plain", {}, container("com.veltra.settingsd"), 1},
+        {"the next request", "plain", {}, container("nobody"), 55},
+        {"its own of that name", "com.veltra.settingsd", {}, container(nullptr), 55},
+        {"any, with the power", "lookup", powerful, container("nobody"), 1},
+        {"nobody's", std::nullopt, {}, container(nullptr), 11},
+        {"its group", "member", member, group("systemgroup.s"), 1},
+        {"a group without its prefix", "member", member, group("bare"), 55},
+        {"a well-known group", "plain", {}, group("systemgroup.com.veltra.fonts"), 1},
+        {"an unknown group", "plain", {}, group("systemgroup.s"), 55},
+        {"another's group", "plain", {}, groupOf("member", "systemgroup.s"), 55},
+        {"its group, as another", "member", member, groupOf("plain", "systemgroup.s"), 21},
+        {"no group", "member", member, group(5), 55},
+        {"no client", std::nullopt, {}, group("systemgroup.s"), 55},
     };
     for (const Row& row : rows) {
         SCOPED_TRACE(row.name);
         asClient(row.client, row.entitlements);
-        world.log.take();
         const Dictionary reply = request(row.message);
         EXPECT_EQ(errorOf(reply), row.code);
         const std::string* path = reply.string("ReplyPath");
@@ -176,7 +141,6 @@ TEST_F(Shared, SystemContainersAndGroups) {
             EXPECT_TRUE(isThere(*path));
             EXPECT_EQ(request(row.message), reply);
         }
-        EXPECT_EQ(hasLine(world.log.take(), 3, "systemGroupContainerPath", row.said), !row.said.empty());
     }
     // What cannot be made is not found, whatever the reason.
     asClient("plain");
@@ -229,18 +193,13 @@ TEST_F(Shared, PeersRegisterThemselves) {
     (void)request(ask);
     EXPECT_TRUE(registered().dictionary(byCaller)->isTrue("bare"));
     EXPECT_EQ(registered().find("bare"), nullptr);
-    asClient({});
-    world.log.take();
-    EXPECT_EQ(codeOf(ask), 11U);
-    EXPECT_TRUE(hasLine(world.log.take(), 3, handler, "Error processing entitlements for (null) : 18"));
-    // A registration that cannot be saved is said, and made up for.
+    // A registration that cannot be saved is made up for.
     asClient("late", first);
     world.disk().arm({.error = ENOSPC, .filter = [](const DiskCallInfo& call) {
                           return call.subject.ends_with("-> zor_entitlements.plist");
                       }});
     EXPECT_EQ(codeOf(ask), 1U);
     world.disk().disarm();
-    EXPECT_TRUE(hasLine(world.log.take(), 3, handler, "Error processing entitlements for late : 59"));
     EXPECT_EQ(codeOf(ask), 1U);
     world.restart();
     EXPECT_TRUE(mapping().identifierHasCallerRegisteredEntitlements("late"));

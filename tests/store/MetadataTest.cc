@@ -28,53 +28,29 @@ protected:
     World world;
 };
 
-// Goal: the first failing step decides, with its own words. Method: one change to a good file a row.
-TEST_F(Metadata, RefusesByTheFirstFailingStep) {
-    struct Row {
-        const char* key;
-        std::optional<Value> value; // absent: the key is
-        std::string message;
+// Goal: whatever is not as it must be makes a file invalid, and is said. Method: one change to a good file a row.
+TEST_F(Metadata, RefusesWhatIsNotAsItMustBe) {
+    const std::optional<Value> absent;
+    const std::pair<const char*, std::optional<Value>> rows[] = {
+        {"ZORMetadataPersona", 502},         {"ZORMetadataPersona", -1},
+        {"ZORMetadataPersona", "502 \""},    {"ZORMetadataIdentifier", absent},
+        {"ZORMetadataIdentifier", 5},        {"ZORMetadataIdentifier", std::string(1025, 'i')},
+        {"ZORMetadataUUID", absent},         {"ZORMetadataUUID", 5},
+        {"ZORMetadataUUID", "nonsense"},     {"ZORMetadataUUID", "{0000000-0000-4000-8000-000000000001}"},
+        {"ZORMetadataContentClass", absent}, {"ZORMetadataContentClass", 0},
+        {"ZORMetadataContentClass", 14},     {"ZORMetadataContentClass", std::int64_t{4294967298}},
+        {"ZORMetadataContentClass", -1},     {"ZORMetadataContentClass", 4}, // in another class's directory
+        {"ZORMetadataInfo", true},           {"ZORMetadataInfo", Array{}},
     };
-    const std::string at = " at " + world.path(container);
-    const Value tooLong(std::string(1025, 'i'));
-    const auto shown = [](const Value& value) { return plist::describe(&value); };
-    const Row rows[] = {
-        {"ZORMetadataPersona", 502, "Incorrect UserId: 502, expecting: 501" + at},
-        {"ZORMetadataPersona", -1, "Incorrect UserId: -1, expecting: 501" + at},
-        {"ZORMetadataPersona", "502 \"", "Incorrect UserId: 502 \", expecting: 501" + at},
-        {"ZORMetadataIdentifier", {}, "Invalid metadata Identifier: (null)" + at},
-        {"ZORMetadataIdentifier", 5, "Invalid metadata Identifier: 5" + at},
-        {"ZORMetadataIdentifier", tooLong, "Invalid metadata Identifier: " + shown(tooLong) + at},
-        {"ZORMetadataUUID", {}, "Invalid metadata UUID String: (null)" + at},
-        {"ZORMetadataUUID", 5, "Invalid metadata UUID String: 5" + at},
-        {"ZORMetadataUUID", "nonsense", "Invalid metadata UUID: nonsense" + at},
-        {"ZORMetadataUUID", "{0000000-0000-4000-8000-000000000001}",
-         "Invalid metadata UUID: {0000000-0000-4000-8000-000000000001}" + at},
-        {"ZORMetadataContentClass", {}, "Invalid metadata Class: (null)" + at},
-        {"ZORMetadataContentClass", 0, "Invalid metadata Content Class: 0" + at},
-        {"ZORMetadataContentClass", 14, "Invalid metadata Content Class: 14" + at},
-        {"ZORMetadataContentClass", std::int64_t{4294967298}, "Invalid metadata Content Class: 4294967298" + at},
-        {"ZORMetadataContentClass", -1, "Invalid metadata Content Class: -1" + at},
-        {"ZORMetadataInfo", true, "Invalid metadata Info: " + shown(true) + at},
-        {"ZORMetadataInfo", Array{}, "Invalid metadata Info: " + shown(Array{}) + at},
-        {"ZORMetadataContentClass", 4,
-         "Invalid metadata-URLs should match: " + world.path(container) + " : " + world.path(mobileContainers) +
-             "/Data/KolvexPlugin"},
-        {"", {}, "Incorrect UserId: 33, expecting: 501" + at},
-    };
-    for (const Row& row : rows) {
-        SCOPED_TRACE(row.message);
+    for (const auto& [key, value] : rows) {
+        SCOPED_TRACE(std::string(key) + " " + plist::describe(value ? &*value : nullptr).substr(0, 40));
         Dictionary content = good();
-        content.erase(row.key);
-        if (row.value)
-            content.set(row.key, *row.value);
-        else if (*row.key == '\0')
-            content = {{"ZORMetadataPersona", 33}, {"ZORMetadataInfo", 1}};
+        content.erase(key);
+        if (value)
+            content.set(key, *value);
         world.putContainer(container, content);
-        EXPECT_EQ(complaintOf(read()), "29 " + row.message);
-        const auto said = world.log.take();
-        ASSERT_EQ(said.size(), 1U);
-        EXPECT_TRUE(support::hasLine(said, 3, "readAndValidateMetadataAtUrl", row.message)) << said[0];
+        EXPECT_EQ(codeOf(read()), ErrorCode::metadataInvalid);
+        EXPECT_EQ(world.complaints("readAndValidateMetadataAtUrl").size(), 1U);
     }
 }
 
@@ -90,33 +66,26 @@ TEST_F(Metadata, HostileFilesReadAsUnreadable) {
         [&] { ASSERT_EQ(::symlink(elsewhere.c_str(), file.c_str()), 0); },
         [&] { ASSERT_EQ(::link(elsewhere.c_str(), file.c_str()), 0); },
         [&] { ASSERT_EQ(::mkfifo(file.c_str(), 0644), 0); },
-        [&] { ASSERT_EQ(::mkdir(file.c_str(), 0755), 0); },
-        [&] { world.write(metadataPath, bytes, 0664); },
         [&] { world.write(metadataPath, bytes, 0646); },
         [&] { world.write(metadataPath, bytes + std::string(1 << 20, '\0')); },
-        [&] { world.write(metadataPath, "nonsense"); },
         [&] { world.write(metadataPath, binary(Array{1})); },
+        [&] {
+            world.write(metadataPath, bytes);
+            ASSERT_TRUE(::geteuid() != 0 || ::chown(file.c_str(), mobile, mobile) == 0);
+        },
     };
     for (const auto& make : hostile) {
         SCOPED_TRACE(&make - hostile);
         make();
-        EXPECT_EQ(complaintOf(read()), "12 Failed to read metadata at URL " + world.path(container));
-        EXPECT_EQ(world.log.take().size(), 1U);
+        EXPECT_EQ(read().has_value(), ::geteuid() != 0 && &make == std::end(hostile) - 1);
         ASSERT_TRUE(::remove(file.c_str()) == 0 || errno == ENOENT);
     }
     world.write(metadataPath, bytes);
     EXPECT_TRUE(read());
-    if (::geteuid() == 0) {
-        ASSERT_EQ(::chown(file.c_str(), mobile, mobile), 0);
-        EXPECT_EQ(codeOf(read()), ErrorCode::metadataUnreadable);
-        ASSERT_EQ(::chown(file.c_str(), 0, 0), 0);
-    }
     // The whole container behind a link.
     ASSERT_EQ(::rename(world.path(container).c_str(), world.path("moved").c_str()), 0);
     ASSERT_EQ(::symlink(world.path("moved").c_str(), world.path(container).c_str()), 0);
     EXPECT_FALSE(read());
-    if (::geteuid() != 0)
-        GTEST_SKIP() << "its owner's own file needs root";
 }
 
 // Goal: no persona means whoever asks; the class path counts only where asked. Method: one file of both.
@@ -162,10 +131,7 @@ TEST_F(Metadata, IsWrittenInOneForm) {
 
     (*record)->setInfo(nullptr);
     world.refuse(support::DiskCall::write, ENOSPC);
-    const auto failed = write();
-    EXPECT_EQ(complaintOf(failed), "34 Failed to write metadata dictionary to URL " + world.path(container));
-    ASSERT_NE(failed.error().underlying(), nullptr);
-    EXPECT_TRUE(failed.error().underlying()->isPosix(ENOSPC));
+    EXPECT_EQ(codeOf(write()), ErrorCode::propertyListNotWritten);
     EXPECT_EQ(world.readDictionary(metadataPath), expected);
     EXPECT_EQ(world.names(container).size(), 1U);
 }

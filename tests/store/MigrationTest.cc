@@ -15,7 +15,6 @@ using plist::Array;
 using plist::Dictionary;
 using support::DiskCall;
 using support::FaultSpan;
-using support::hasLine;
 
 const std::string former = std::string(mobileContainers) + "/Bundle";
 const std::string bundles = std::string(sharedPath) + "/Bundle";
@@ -64,17 +63,12 @@ TEST(Migration, BundlesMoveOnce) {
     EXPECT_EQ(world.item(bundles + "/Framework/" + secondUuid), directoryOf(33)); // re-owned all the same
     EXPECT_EQ(world.read(moved + "/program"), "code");
     EXPECT_EQ(world.item(metadataIn(moved)), "file 0644 0:0");
-    EXPECT_TRUE(hasLine(world.log.take(), 5, "performMigrationWithError",
-                        "Changing ownership of bundle container content. 1 errors so far"));
-    const Dictionary marker = world.readDictionary(bundleMarker);
-    EXPECT_EQ(*marker.string("ZORMigrationVersionNumber"), "Unknown");
-    EXPECT_EQ(marker.string("ZORMigrationTime")->size(), 25U);
+    EXPECT_EQ(world.readDictionary(bundleMarker).string("ZORMigrationTime")->size(), 25U);
 
     putFormerBundle(world, former + "/Application/" + secondUuid, "com.example.b");
     world.restart();
     const auto again = migrateBundles(world);
     EXPECT_TRUE(again.succeeded && !again.error);
-    EXPECT_TRUE(world.log.take().empty());
     EXPECT_TRUE(world.exists(former + "/Application/" + secondUuid));
     EXPECT_EQ(world.find("com.example.app", ContainerClass::bundleApplication)->path, world.path(moved));
 }
@@ -204,32 +198,20 @@ TEST(Migration, WellknownContainers) {
     world.putContainer(system + firstUuid, metadataOf(12, 499, identifier));
     world.putContainer(system + secondUuid, metadataOf(12, 499, "com.example.other"));
     world.putContainer(group + firstUuid, metadataOf(13, 499, "systemgroup.com.veltra.fonts"));
-    world.load();
-    world.log.take();
     auto& migrator = world.services().store().migrator;
     EXPECT_EQ(migrator.performWhitelistMigrationWithError().migrated, 2U);
     EXPECT_TRUE(world.exists(system + secondUuid));
     EXPECT_TRUE(world.exists(group + "systemgroup.com.veltra.fonts"));
-    EXPECT_TRUE(hasLine(world.log.take(), 3, "performWhitelistMigrationWithError",
-                        "Migrating well-known container com.veltra.settingsd"));
     const auto found = world.services().cache().containerForUser(499, ContainerClass::dataSystem, &identifier, false);
     ASSERT_TRUE(found);
     EXPECT_EQ((*found)->url().path(), world.path(system + identifier));
     EXPECT_EQ(migrator.performWhitelistMigrationWithError().migrated, 0U);
-    EXPECT_TRUE(world.log.take().empty());
 
     World taken;
     taken.putContainer(system + firstUuid, metadataOf(12, 499, identifier));
     taken.write(system + identifier + "/something", "x");
-    taken.load();
-    taken.log.take();
     EXPECT_FALSE(taken.services().store().migrator.performWhitelistMigrationWithError().succeeded);
     EXPECT_TRUE(taken.exists(system + firstUuid));
-    const auto said = taken.complaints("performWhitelistMigrationWithError");
-    ASSERT_EQ(said.size(), 2U);
-    EXPECT_TRUE(
-        said[1].starts_with("-[ZORContainerMigrator performWhitelistMigrationWithError:]: Failed to move system "
-                            "container com.veltra.settingsd from "));
 }
 
 /// A container that keeps its group itself, as an older system left it.
@@ -258,8 +240,6 @@ TEST(Migration, GroupIdentifiers) {
     EXPECT_EQ(migrate(), 1U);
     world.disk().disarm();
     EXPECT_FALSE(world.exists(groupMarker));
-    EXPECT_TRUE(hasLine(world.log.take(), 3, "migrateAppGroupIdsFromDataContainersToFile",
-                        "Not writing the migration complete file because there we had 1 error(s)"));
     world.restart();
     world.load();
     EXPECT_EQ(migrate(), 1U);
@@ -269,9 +249,7 @@ TEST(Migration, GroupIdentifiers) {
                   ZOREntitlementMapping::Identifiers({"group." + identifier}));
     EXPECT_EQ(*world.readDictionary(metadataIn(applications + "/" + firstUuid)).dictionary("ZORMetadataInfo"),
               (Dictionary{{"kept", true}}));
-    world.log.take();
     EXPECT_EQ(migrate(), 0U);
-    EXPECT_TRUE(world.log.take().empty());
 }
 
 // Goal: until the migration has ended no application group goes because the map does not mention it; then each goes
@@ -292,8 +270,6 @@ TEST(Migration, GroupsStayUntilTheirIdentifiersAreMigrated) {
     ASSERT_EQ(::symlink("/", world.path(plugins).c_str()), 0);
     boot(world);
     EXPECT_EQ(world.names(groups).size(), 2U);
-    EXPECT_EQ(world.complaints("reconcileGroupContainersOfType"),
-              std::vector<std::string>{"Failed to get reference count information for group type: 0"});
     world.restart();
     ZOREntitlementMapping& mapping = world.services().entitlements();
     const Dictionary entitled{{std::string(entitlementKeys::applicationGroups), Array{"group.a"}}};

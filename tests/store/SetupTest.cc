@@ -14,9 +14,6 @@
 namespace zor::test {
 namespace {
 
-using support::hasLine;
-using support::LogLine;
-
 const std::string shared = sharedPath;
 constexpr const char* goodUuid = "11111111-0000-4000-8000-000000000000";
 constexpr const char* lowerUuid = "abcdef00-0000-4000-8000-00000000000a";
@@ -97,11 +94,7 @@ TEST(Setup, Orphans) {
     EXPECT_TRUE(world.exists(applications + "/" + fileNamed));
     const auto dying = world.deathRow();
     EXPECT_EQ(std::multiset<std::string>(dying.begin(), dying.end()), gone);
-    const auto said = world.complaints(cleanup);
-    const std::string missing = "Deleting orphaned data missing a metadata file at: ";
-    EXPECT_EQ(std::set<std::string>(said.begin(), said.end()),
-              (std::set<std::string>{missing + world.path(applications + "/" + bareUuid),
-                                     missing + world.path(secondsGroups + "/" + bareUuid)}));
+    EXPECT_EQ(world.complaints(cleanup).size(), 2U);
 }
 
 // Goal: a table of well-known names that cannot be read whole costs no container, and moves none; one that says less
@@ -132,10 +125,7 @@ TEST(Setup, ATableThatCannotBeReadDeletesNothing) {
         };
         boot(bytes, mode);
         EXPECT_EQ(world.names(system), (std::vector<std::string>{goodUuid, "short-name"}));
-        EXPECT_EQ(world.complaints(cleanup),
-                  std::vector<std::string>{"Leaving " + world.path(system + "/short-name") +
-                                           ": the table of well-known containers, which may name it, could not be "
-                                           "read"});
+        EXPECT_EQ(world.complaints(cleanup).size(), 1U);
         boot(naming(plist::Dictionary{{settings, "settings"}}), 0644);
         EXPECT_EQ(world.names(system), std::vector<std::string>{"settings"});
     }
@@ -174,8 +164,6 @@ TEST(Setup, BootAndLaunch) {
     EXPECT_TRUE(std::ranges::none_of(transient, isThere));
     EXPECT_TRUE(world.daemonsClient().containersForUser(mobile, application, asTransient)->empty());
     EXPECT_FALSE(world.exists("private/var/nowhere"));
-    for (const LogLine& line : world.log.take())
-        EXPECT_FALSE(line.message.starts_with("Failed to delete")) << line;
 }
 
 // Goal: a pass that fails ends alone, and a daemon that is to end stops between items and leaves the rest, and the
@@ -213,33 +201,20 @@ TEST(Setup, EndsWithOnePassOrWhenItIsToldTo) {
     EXPECT_GT(looks, 10);
 }
 
-// Goal: no failure stops a setup. Method: a disk on which no move succeeds; every step says so and the rest runs.
+// Goal: no failure stops a setup, and no link is followed. Method: a disk on which no move succeeds; somebody's links
+// in the places of two directories.
 TEST(Setup, GoesOnAfterFailures) {
     World world;
     world.makeDirectories(staging + "/half-made");
     world.load();
-    ZORGlobalConfiguration& configuration = world.services().configuration();
-    configuration.transientDirectory();
-    configuration.transientBundleDirectory();
-    configuration.getPerUserConfigurationForUserId(mobile)->transientDirectory();
-    configuration.deathrowDirectory();
-    world.log.take();
+    world.services().configuration().getPerUserConfigurationForUserId(mobile)->transientDirectory();
     world.refuse(support::DiskCall::rename, EROFS, support::FaultSpan::fromThenOn);
     world.boot();
     world.disk().disarm();
-    std::vector<std::string> starts;
-    for (const std::string& message : world.complaints("rebootContainerManagerSetup"))
-        starts.push_back(message.substr(0, message.find(" : ")));
-    EXPECT_EQ(starts, (std::vector<std::string>{
-                          "Failed to migrate bundle containers to system location",
-                          "Failed to migrate whitelisted bundle containers",
-                          "Failed to delete shared transient URL " + world.path(cachesPath) + "/Temp",
-                          "Failed to delete shared transient bundle URL " +
-                              world.path("private/var/brevad/Library/Caches/com.veltra.zorvaned"),
-                          "Failed to delete per-user transient URL " + world.path(mobileCaches) + "/Temp",
-                      }));
+    const auto said = world.complaints("rebootContainerManagerSetup");
+    ASSERT_GE(said.size(), 5U);
+    EXPECT_TRUE(said.back().starts_with("Failed to delete per-user transient URL")) << said.back(); // the last pass
     EXPECT_TRUE(world.exists(staging + "/half-made"));
-    // Somebody's link in the place of a directory is neither followed nor emptied.
     world.makeDirectories("elsewhere/kept");
     for (const std::string& place : {journals, applications}) {
         std::filesystem::remove_all(world.path(place));
@@ -247,33 +222,18 @@ TEST(Setup, GoesOnAfterFailures) {
     }
     world.boot();
     EXPECT_TRUE(world.exists("elsewhere/kept"));
-    std::set<std::string> unread;
-    for (const LogLine& line : world.log.take())
-        if (line.message.starts_with("Failed to get items at ") ||
-            line.message.starts_with("Failed to create container dir at "))
-            unread.insert(line.function);
-    EXPECT_EQ(unread, (std::set<std::string>{"containerDirectoryURLForContentClass",
-                                             "_recoverFromReplaceOperationsWithError"}));
 }
 
-// Goal: a mapping is removed, then set; either failure is said. Method: a table over class and failure.
-TEST(SandboxMapping, RemovesThenSets) {
+// Goal: a mapping leads to the live container or is gone, and one that leads to nothing, or out of the root, goes with
+// the next launch. Method: each class that has mappings; then links as a stop, or somebody else, leaves them.
+TEST(SandboxMapping, LeadsToTheContainer) {
     World world;
-    world.load();
-    world.log.take();
     const std::string identifier = "com.example/odd";
     const FileURL url = world.url("private/var/mobile");
     const auto map = [&](ContainerClass containerClass, const std::optional<FileURL>& to) {
         return world.daemonsClient()._setSandboxContainerMappingForUser(mobile, identifier, containerClass, to);
     };
-    constexpr const char* function = "_setSandboxContainerMappingForUser";
-    for (const ContainerClass unsupported : {ContainerClass::bundleApplication, ContainerClass::dataSystem,
-                                             ContainerClass::sharedSystemGroup, ContainerClass::undefined}) {
-        EXPECT_FALSE(map(unsupported, url));
-        EXPECT_EQ(world.complaints(function),
-                  (std::vector<std::string>{"Unsupported class for setting sandbox container mapping: " +
-                                            std::to_string(static_cast<int>(unsupported))}));
-    }
+    EXPECT_FALSE(map(ContainerClass::dataSystem, url));
     for (const auto& [containerClass, type] :
          {std::pair(application, "1"), std::pair(ContainerClass::sharedAppGroup, "2")}) {
         const std::string directory = std::string("run/zorvane/sandbox/501/") + type;
@@ -284,31 +244,22 @@ TEST(SandboxMapping, RemovesThenSets) {
         for (int i = 0; i < 2; ++i)
             EXPECT_TRUE(map(containerClass, std::nullopt));
         EXPECT_TRUE(world.names(directory).empty());
-        world.sandbox.removeError = EIO;
-        EXPECT_FALSE(map(containerClass, url));
-        world.sandbox.removeError = 0;
-        world.sandbox.setError = ENOSPC;
-        EXPECT_FALSE(map(containerClass, url));
-        world.sandbox.setError = 0;
-        const std::string mapping = std::string("mapping for user: 501, itemType: ") + type + ", identifier";
-        const std::string tail =
-            "com.example/odd, class: " + std::to_string(static_cast<int>(containerClass)) + ", path: ";
-        EXPECT_EQ(world.complaints(function),
-                  (std::vector<std::string>{"Failed to remove " + mapping + ": " + tail + "(null) : 5",
-                                            "Failed to set " + mapping + " " + tail + url.path() + " : 28"}));
+        for (int* error : {&world.sandbox.removeError, &world.sandbox.setError}) {
+            *error = EIO;
+            EXPECT_FALSE(map(containerClass, url));
+            *error = 0;
+        }
     }
-    // A stop between the move of a container and its mapping leaves one that points to nothing; the launch removes it,
-    // unless the home that is there may be no more than the place where the real one is mounted.
     ASSERT_TRUE(map(application, world.url("private/var/mobile/gone")));
     ASSERT_TRUE(map(ContainerClass::sharedAppGroup, url));
+    // The home that is there may be no more than the place where the real one is mounted.
     world.daemonsClient().containerManagerSetup();
     EXPECT_EQ(world.names("run/zorvane/sandbox/501/1").size(), 1U);
     world.makeDirectories(mobileContainers, mobile);
+    ASSERT_EQ(::symlink("/etc", world.path("run/zorvane/sandbox/501/1/outside").c_str()), 0);
     world.daemonsClient().containerManagerSetup();
     EXPECT_TRUE(world.names("run/zorvane/sandbox/501/1").empty());
     EXPECT_EQ(world.names("run/zorvane/sandbox/501/2").size(), 1U);
-    EXPECT_TRUE(
-        hasLine(world.log.take(), 5, "containerManagerSetup", "Removed 1 sandbox mappings whose container is gone"));
 }
 
 } // namespace

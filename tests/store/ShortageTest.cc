@@ -41,91 +41,150 @@ protected:
     World world;
 };
 
-// Goal: a launch that cannot read the journals deletes nothing that they name. Method: a stopped replace, a launch with
-// few descriptors or something else in the journals' place; then a request for the old one, and a launch as it should
-// be.
+// Goal: a launch that cannot read the journals deletes nothing that they name. Method: a stopped replace, something
+// else in the journals' place, then requests, and a launch as it should be.
 TEST_F(Shortage, JournalsThatCannotBeReadKeepWhatTheyName) {
     const FoundContainer old = world.make("old");
-    const std::string content = world.relative(old.path) + "/content";
-    world.write(content, "old");
-    for (rlim_t left = 0; left <= descriptorsMax; ++left) {
-        SCOPED_TRACE(left);
-        stopAReplaceOf(old);
-        if (left == descriptorsMax) {
-            const std::string there = world.path(journals);
-            std::filesystem::rename(there, there + ".aside");
-            world.write(journals, "no directory");
-            relaunch();
-            EXPECT_EQ(codeOf(world.create("old")), ErrorCode::journalUnusable);
-            EXPECT_TRUE(world.create("another"));
-            std::filesystem::remove(there);
-            std::filesystem::rename(there + ".aside", there);
-        } else {
-            world.restart();
-            world.load();
-            const support::FewDescriptors few(left);
-            world.daemonsClient().containerManagerSetup();
-        }
-        const FoundContainer found = world.make("old");
-        EXPECT_EQ(found.uuid, old.uuid);
-        EXPECT_EQ(found.path, old.path);
+    stopAReplaceOf(old);
+    const std::string there = world.path(journals);
+    std::filesystem::rename(there, there + ".aside");
+    world.write(journals, "no directory");
+    relaunch();
+    EXPECT_EQ(codeOf(world.create("old")), ErrorCode::journalUnusable);
+    EXPECT_TRUE(world.create("another"));
+    std::filesystem::remove(there);
+    std::filesystem::rename(there + ".aside", there);
+    for (int launch = 0; launch < 2; ++launch) {
+        EXPECT_EQ(world.make("old").path, old.path);
         relaunch();
-        ASSERT_EQ(world.read(content), "old");
     }
 }
 
-// Goal: a shortage of moments loses, doubles and keeps nothing of what it met. Method: a launch that finds a stopped
-// replace, requests and a deletion, while the limit of descriptors comes and goes.
-TEST_F(Shortage, ALimitThatComesAndGoes) {
-    const FoundContainer old = world.make("old");
-    const std::string content = world.relative(old.path) + "/content";
-    world.write(content, "old");
-    const std::string victim = "victim";
-    for (int round = 0; round < 150; ++round) {
-        SCOPED_TRACE(round);
-        (void)world.make(victim);
-        stopAReplaceOf(old);
-        world.restart();
-        world.load();
-        {
-            const support::DescriptorsThatComeAndGo limit;
-            world.daemonsClient().containerManagerSetup();
-            const auto found = world.create("old");
-            EXPECT_TRUE(!found || found->uuid == old.uuid);
-            (void)world.daemonsClient().deleteContainerForUser(mobile, &victim, application, false);
-        }
-        EXPECT_EQ(world.make("old").uuid, old.uuid);
-        const FoundContainer either = world.make(victim); // gone, or whole
-        EXPECT_TRUE(isThere(either.path + "/Library/Preferences"));
-        relaunch();
-        ASSERT_EQ(world.read(content), "old");
-        ASSERT_EQ(world.names(applications).size(), 2U);
-    }
-}
-
-// Goal: a size that was measured in part is not kept. Method: each number of descriptors left, then all.
-TEST_F(Shortage, ASizeMeasuredInPartIsNotKept) {
-    int inPart = 0;
+// Goal: want of descriptors loses, doubles, brings back and keeps nothing. Method: each operation with each number of
+// descriptors left, then while the limit comes and goes; what it left is looked at without a limit, and launched over.
+TEST_F(Shortage, EachOperationWithFewDescriptors) {
+    constexpr rlim_t comings = 30;
+    rlim_t round = 0;
+    const FoundContainer kept = world.make("kept");
+    world.write(world.relative(kept.path) + "/content", "kept");
+    FoundContainer old;
+    FoundContainer fresh;
+    std::string before;
+    std::uint64_t bytes = 0;
+    bool done = false;
+    int failed = 0;
+    const auto contentOf = [&](const FoundContainer& one) { return world.read(world.relative(one.path) + "/content"); };
+    const auto remember = [&] { EXPECT_EQ(world.make("kept").uuid, kept.uuid); };
+    const auto askForKept = [&] {
+        const auto found = world.create("kept");
+        EXPECT_TRUE(!found || found->uuid == kept.uuid);
+        done = found.has_value();
+    };
+    const auto makeOld = [&](ContainerClass containerClass = application) {
+        old = world.make("old" + std::to_string(round), containerClass);
+        world.write(world.relative(old.path) + "/content", "old");
+        world.write(world.relative(old.path) + "/a/b/c/d/e/f/g/h/i/j/k/l/file", std::string(100'000, 'x'));
+        before = support::readTree(old.path).describe();
+    };
+    const auto deleteOld = [&] {
+        const std::string identifier = old.record->identifier();
+        return world.daemonsClient().deleteContainerForUser(old.record->uid(), &identifier,
+                                                            old.record->containerClass(), false);
+    };
+    const auto size = [&] {
+        const auto usage = world.daemonsClient().diskUsageForUserId(addressOf(old));
+        bytes = usage.bytes;
+        done = usage.error == ErrorCode::success && bytes >= 100'000;
+    };
     world.services().store().usageSettledTime = {};
-    for (rlim_t left = 0; left < descriptorsMax; ++left) {
-        SCOPED_TRACE(left);
-        const FoundContainer bundle = world.make("size" + std::to_string(left), ContainerClass::bundleApplication);
-        world.write(world.relative(bundle.path) + "/a/b/c/d/e/f/g/h/i/j/k/l/file", std::string(100'000, 'x'));
-        const ZORClientConnection::ContainerAddress address{.userId = bundle.record->uid(),
-                                                            .uuid = bundle.uuid,
-                                                            .identifier = bundle.record->identifier(),
-                                                            .containerClass = ContainerClass::bundleApplication};
-        std::uint64_t measured = 0;
-        {
-            const support::FewDescriptors few(left);
-            measured = world.daemonsClient().diskUsageForUserId(address).bytes;
+    struct Operation {
+        const char* name;
+        std::function<void()> prepare;
+        std::function<void()> run;
+        std::function<void()> judge;
+    };
+    const Operation operations[] = {
+        {"lookup", [&] { world.restart(); }, askForKept, remember},
+        {"list", remember,
+         [&] {
+             const auto all = world.daemonsClient().containersForUser(mobile, application, false);
+             EXPECT_TRUE(!all || all->size() == 1);
+             done = all.has_value();
+         },
+         remember},
+        {"record", remember,
+         [&] {
+             const auto code = codeOf(world.daemonsClient().metadataForUser(addressOf(kept)));
+             EXPECT_NE(code, ErrorCode::notFound);
+             done = code == ErrorCode::success;
+         },
+         remember},
+        {"size", [&] { makeOld(ContainerClass::bundleApplication); }, size,
+         [&] {
+             size();
+             EXPECT_TRUE(done) << bytes;
+         }},
+        {"deletion", [&] { makeOld(); }, [&] { done = deleteOld().has_value(); },
+         [&] {
+             const bool stays = isThere(old.path);
+             EXPECT_TRUE(!stays || support::readTree(old.path).describe() == before);
+             EXPECT_EQ(deleteOld().has_value(), stays);
+         }},
+        {"replace",
+         [&] {
+             makeOld();
+             fresh = world.make(old.record->identifier(), application, asTransient);
+             world.write(world.relative(fresh.path) + "/content", "new");
+         },
+         [&] {
+             using enum ZORClientConnection::PreserveOldUUID;
+             done = world.replace(&old, fresh, round % 2 == 0 ? no : yes).has_value();
+         },
+         [&] {
+             const auto now = world.find(old.record->identifier());
+             ASSERT_TRUE(now);
+             EXPECT_TRUE(contentOf(*now) == "new" || (!done && contentOf(*now) == "old"));
+             ASSERT_TRUE(deleteOld());
+             relaunch();
+             EXPECT_FALSE(world.find(old.record->identifier()));
+         }},
+        {"launch over a stopped replace",
+         [&] {
+             stopAReplaceOf(kept);
+             world.restart();
+             world.load();
+         },
+         [&] {
+             world.daemonsClient().containerManagerSetup();
+             askForKept();
+         },
+         [&] {
+             EXPECT_EQ(world.make("kept").path, kept.path);
+             relaunch();
+         }},
+    };
+    for (const Operation& operation : operations) {
+        SCOPED_TRACE(operation.name);
+        failed = 0;
+        for (round = 0; round < descriptorsMax + comings; ++round) {
+            SCOPED_TRACE(round);
+            operation.prepare();
+            {
+                std::optional<support::FewDescriptors> few;
+                std::optional<support::DescriptorsThatComeAndGo> limit;
+                if (round < descriptorsMax)
+                    few.emplace(round);
+                else
+                    limit.emplace();
+                operation.run();
+            }
+            failed += done ? 0 : 1;
+            operation.judge();
         }
-        const auto whole = world.daemonsClient().diskUsageForUserId(address);
-        EXPECT_EQ(whole.error, ErrorCode::success);
-        EXPECT_GE(whole.bytes, 100'000U);
-        inPart += measured < whole.bytes ? 1 : 0;
+        EXPECT_GT(failed, 0);
+        EXPECT_EQ(contentOf(kept), "kept");
+        EXPECT_EQ(world.names(applications).size(), 1U);
     }
-    EXPECT_GT(inPart, 1);
 }
 
 // Goal: what a client was told to have failed is saved when it asks again. Method: a want of memory, then a launch.

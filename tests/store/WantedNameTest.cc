@@ -21,11 +21,6 @@ struct Row {
     ErrorCode code = ErrorCode::success;
 };
 
-ZORClientConnection::ContainerAddress addressOf(const FoundContainer& container) {
-    const ZORMetadata& record = *container.record;
-    return {record.uid(), container.uuid, record.identifier(), record.containerClass()};
-}
-
 std::function<ErrorCode(World&)> creating(bool transient) {
     return [transient](World& world) { return codeOf(world.create("com.example.new", application, transient)); };
 }
@@ -50,15 +45,7 @@ ErrorCode measuring(World& world) {
 ErrorCode replacing(World& world) {
     const auto old = world.find("app");
     const auto fresh = world.make("app", application, asTransient);
-    return codeOf(world.daemonsClient().replaceContainer({.oldUuid = old->uuid,
-                                                          .newUuid = fresh.uuid,
-                                                          .userIdOld = mobile,
-                                                          .userIdNew = mobile,
-                                                          .identifierOld = "app",
-                                                          .identifierNew = "app",
-                                                          .classOld = application,
-                                                          .classNew = application},
-                                                         StartDeletionThread::no));
+    return codeOf(world.replace(&*old, fresh));
 }
 
 ErrorCode booting(World& world) {

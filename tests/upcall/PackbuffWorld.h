@@ -2,6 +2,8 @@
 // Bytes for the tests of packed buffers: as people write them, and at the very end of the memory that may be read.
 #pragma once
 
+#include "world/UpcallPackets.h"
+
 #include <algorithm>
 #include <cstdint>
 #include <cstdio>
@@ -13,11 +15,8 @@
 #include <string>
 #include <sys/mman.h>
 #include <unistd.h>
-#include <vector>
 
 namespace zor::test {
-
-using ByteVector = std::vector<std::uint8_t>;
 
 /// Pairs of digits; a "#" and what follows it on its line is ignored, and so are spaces.
 inline ByteVector fromHex(const std::string& text) {

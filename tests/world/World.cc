@@ -10,7 +10,9 @@
 #include <fstream>
 #include <future>
 #include <iterator>
+#include <sched.h>
 #include <stdexcept>
+#include <sys/mount.h>
 #include <unistd.h>
 
 namespace zor::test {
@@ -26,7 +28,8 @@ bool canGiveAway() {
     return ::geteuid() == 0;
 }
 
-platform::Platform withRoles(const platform::Platform& real, World& world) {
+platform::Platform withRoles(const platform::Platform& real, World& world, platform::BootMarker& marker,
+                             platform::WorkQueue& deathRowQueue) {
     return {.root = real.root,
             .disk = world.disk(),
             .log = world.log,
@@ -38,9 +41,9 @@ platform::Platform withRoles(const platform::Platform& real, World& world) {
             .sandbox = world.sandbox,
             .assertions = real.assertions,
             .crash = real.crash,
-            .bootMarker = world.bootMarker,
+            .bootMarker = marker,
             .transactions = real.transactions,
-            .deathRowQueue = real.deathRowQueue,
+            .deathRowQueue = deathRowQueue,
             .lockStateQueue = world.lockStateQueue,
             .runLoop = real.runLoop,
             .peers = real.peers,
@@ -73,15 +76,46 @@ std::string directoryOf(std::uint32_t owner, mode_t mode) {
     return text;
 }
 
+void furnish(const std::string& root) {
+    require(::chmod(root.c_str(), 0755) == 0, root);
+    const auto make = [&](const char* directory, std::uint32_t owner = 0, mode_t mode = 0755) {
+        const std::string path = root + "/" + directory;
+        require(::mkdir(path.c_str(), 0755) == 0 && ::chmod(path.c_str(), mode) == 0 &&
+                    (!canGiveAway() || ::chown(path.c_str(), owner, owner) == 0),
+                path);
+    };
+    make("etc");
+    make("tmp", 0, 01777);
+    make("private");
+    make("private/var");
+    make("private/var/root", 0, 0700);
+    make("private/var/mobile", mobile);
+    make("private/var/second", second);
+    make("private/var/brevad", bundleOwnerUserId);
+    std::ofstream(root + "/etc/passwd") << passwd;
+}
+
+bool MountedHome::canBe() {
+    static const bool can =
+        ::unshare(CLONE_NEWNS) == 0 && ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0;
+    return can;
+}
+
+MountedHome::MountedHome(const std::string& root)
+    : path_(root + "/private/var/mobile"),
+      mounted_(canBe() && ::mount("home", path_.c_str(), "tmpfs", 0, "mode=0755,uid=501,gid=501") == 0) {}
+
+MountedHome::~MountedHome() {
+    if (mounted_)
+        ::umount2(path_.c_str(), MNT_DETACH);
+}
+
 World::World(Options options)
-    : log(options.logLevel), options_(std::move(options)), directory_(options_.parent), realDisk_(options_.syncs) {
-    ::chmod(directory_.path().c_str(), 0755);
-    write("etc/passwd", passwd);
-    makeDirectories("tmp", 0, 01777);
-    makeDirectories("private/var/root", 0, 0700);
-    makeDirectories("private/var/mobile", mobile);
-    makeDirectories("private/var/second", second);
-    makeDirectories("private/var/brevad", bundleOwnerUserId);
+    : log(options.logLevel), options_(std::move(options)),
+      root_(options_.root.empty() ? directory_.emplace(options_.parent).path() : options_.root),
+      realDisk_(options_.syncs), faults_(options_.disk ? *options_.disk : realDisk_) {
+    if (directory_)
+        furnish(root_);
     start();
 }
 
@@ -89,15 +123,23 @@ World::~World() {
     platform_->finish();
 }
 
+platform::WorkQueue& World::deathRowQueue() {
+    return options_.disk ? immediately_ : platform_->roles().deathRowQueue;
+}
+
 void World::start() {
-    auto opened = platform::LinuxPlatform::open({.rootDirectory = directory_.path(), .syncs = options_.syncs});
+    auto opened = platform::LinuxPlatform::open({.rootDirectory = root_, .syncs = options_.syncs});
     require(opened.has_value(), "no platform");
     platform_ = std::move(*opened);
-    lockStateQueue.inner = &platform_->roles().lockStateQueue;
-    require(lockStateQueue.start() && platform_->roles().deathRowQueue.start(), "no thread");
-    sandbox.inner = &platform_->roles().sandbox;
+    const platform::Platform roles = platform_->roles();
+    lockStateQueue.inner = options_.disk ? &immediately_ : &roles.lockStateQueue;
+    require(lockStateQueue.start() && deathRowQueue().start(), "no thread");
+    if (options_.disk)
+        links_ = std::make_unique<platform::LinkSandboxUserState>(platform_->root(), *options_.disk);
+    sandbox.inner = links_ ? links_.get() : &roles.sandbox;
     protection_ = std::make_unique<platform::XattrProtectionClass>(faults_, lockState);
-    composition_ = std::make_unique<Composition>(withRoles(platform_->roles(), *this), options_.probe);
+    composition_ = std::make_unique<Composition>(
+        withRoles(roles, *this, options_.marker ? *options_.marker : bootMarker, deathRowQueue()), options_.probe);
 }
 
 void World::restart() {
@@ -144,12 +186,12 @@ Result<FoundContainer> World::find(const std::string& identifier, ContainerClass
 
 void World::drainDeathRow() {
     std::promise<void> reached;
-    platform_->roles().deathRowQueue.async([&] { reached.set_value(); });
+    deathRowQueue().async([&] { reached.set_value(); });
     reached.get_future().wait();
 }
 
 std::string World::path(std::string_view relative) const {
-    return relative.empty() ? directory_.path() : directory_.path() + "/" + std::string(relative);
+    return relative.empty() ? root_ : root_ + "/" + std::string(relative);
 }
 
 void World::makeDirectories(std::string_view relative, std::optional<std::uint32_t> lastOwner, mode_t mode) const {
@@ -235,6 +277,32 @@ std::vector<std::string> World::complaints(std::string_view function) {
 
 std::uint32_t ownerOf(ContainerClass containerClass) {
     return isBundleClass(containerClass) ? 33 : isSystemClass(containerClass) ? 499 : mobile;
+}
+
+Result<void> World::replace(const FoundContainer* old, const FoundContainer& fresh,
+                            ZORClientConnection::PreserveOldUUID preserve) {
+    return daemonsClient().replaceContainer(swapOf(old, fresh, preserve), StartDeletionThread::no);
+}
+
+ZORClientConnection::ContainerAddress addressOf(const FoundContainer& container) {
+    const ZORMetadata& record = *container.record;
+    return {record.uid(), container.uuid, record.identifier(), record.containerClass()};
+}
+
+ZORClientConnection::ReplaceRequest swapOf(const FoundContainer* old, const FoundContainer& fresh,
+                                           ZORClientConnection::PreserveOldUUID preserve) {
+    ZORClientConnection::ReplaceRequest request{.newUuid = fresh.uuid,
+                                                .userIdNew = fresh.record->uid(),
+                                                .identifierNew = fresh.record->identifier(),
+                                                .classNew = fresh.record->containerClass(),
+                                                .preserveOldUuid = preserve};
+    if (old) {
+        request.oldUuid = old->uuid;
+        request.userIdOld = old->record->uid();
+        request.identifierOld = old->record->identifier();
+        request.classOld = old->record->containerClass();
+    }
+    return request;
 }
 
 std::string nameOf(const std::string& path) {

@@ -5,7 +5,7 @@
 //
 // Everything a client is shown or a log line says is the real thing. In the test's hand: the disk may fail (`disk`),
 // the log keeps its lines, the build may be internal, the device may be locked, the boot is a flag. One thread makes,
-// restarts and ends a world.
+// restarts and ends a world. The crash tests put a world on a root and a disk of theirs.
 #pragma once
 
 #include "daemon/Composition.h"
@@ -86,6 +86,16 @@ public:
     std::atomic<int> resumed{0};
 };
 
+/// Runs its jobs at once, on the thread that queues them: the earliest that they can come, and a stop in one reaches
+/// the test.
+class ImmediateQueue final : public platform::WorkQueue {
+public:
+    bool start() override { return true; }
+    void async(std::function<void()> job) override { job(); }
+    void suspend() override {}
+    void resume() override {}
+};
+
 /// Passes on what it is told until it is to fail.
 class FailingSandbox final : public platform::SandboxUserState {
 public:
@@ -108,6 +118,26 @@ std::string itemAt(const std::string& path);
 /// The same text for what should lie there. Owners are judged only where the process can give files away.
 std::string directoryOf(std::uint32_t owner, mode_t mode = 0755);
 
+/// The accounts, homes and directories that a device has before its first daemon.
+void furnish(const std::string& root);
+
+/// private/var/mobile as a file system of its own, in a mount namespace of this process.
+class MountedHome {
+public:
+    /// Of a furnished root. Asked for a namespace before a daemon opens the root, it can be mounted below that later.
+    explicit MountedHome(const std::string& root);
+    ~MountedHome();
+    MountedHome(const MountedHome&) = delete;
+    MountedHome& operator=(const MountedHome&) = delete;
+    /// Only root may have the namespace.
+    static bool canBe();
+    [[nodiscard]] bool mounted() const { return mounted_; }
+
+private:
+    const std::string path_;
+    const bool mounted_;
+};
+
 class World {
 public:
     struct Options {
@@ -115,6 +145,11 @@ public:
         platform::Syncs syncs = platform::Syncs::off;
         int logLevel = logLevelNotice;
         fs::Durability::Probe probe = fs::orderingOfFileSystem;
+        /// One that is furnished, and stays, in place of a new one below `parent`.
+        std::string root = {};
+        /// In place of its own; the sandbox's links are made on it too, and its queues run their jobs at once.
+        platform::Disk* disk = nullptr;
+        platform::BootMarker* marker = nullptr;
     };
     World() : World(Options()) {}
     explicit World(Options options);
@@ -167,6 +202,10 @@ public:
     /// What is under death row's unique directories, sorted.
     [[nodiscard]] std::vector<std::string> deathRow() const;
 
+    /// The new one takes the old one's place; nullptr: that of none.
+    Result<void> replace(const FoundContainer* old, const FoundContainer& fresh,
+                         ZORClientConnection::PreserveOldUUID preserve = ZORClientConnection::PreserveOldUUID::no);
+
     /// A container as an earlier launch left it: `relative` is its directory, made with its parents.
     void putContainer(std::string_view relative, const plist::Dictionary& metadata) const;
 
@@ -186,12 +225,16 @@ public:
 
 private:
     void start();
+    [[nodiscard]] platform::WorkQueue& deathRowQueue();
 
     const Options options_;
-    support::TemporaryDirectory directory_;
+    std::optional<support::TemporaryDirectory> directory_;
+    const std::string root_;
     platform::LinuxDisk realDisk_;
-    support::FaultDisk faults_{realDisk_};
+    support::FaultDisk faults_;
+    ImmediateQueue immediately_;
     std::unique_ptr<platform::LinuxPlatform> platform_;
+    std::unique_ptr<platform::LinkSandboxUserState> links_;
     std::unique_ptr<platform::XattrProtectionClass> protection_;
     std::unique_ptr<Composition> composition_;
 };
@@ -200,6 +243,10 @@ private:
 plist::Dictionary metadataOf(std::uint64_t containerClass, std::uint32_t userId, const std::string& identifier,
                              const std::string& uuid = "00000000-0000-4000-8000-000000000001");
 std::string binary(const plist::Value& value);
+ZORClientConnection::ContainerAddress addressOf(const FoundContainer& container);
+ZORClientConnection::ReplaceRequest
+swapOf(const FoundContainer* old, const FoundContainer& fresh,
+       ZORClientConnection::PreserveOldUUID preserve = ZORClientConnection::PreserveOldUUID::no);
 
 /// The user whose containers of a class the tests make.
 std::uint32_t ownerOf(ContainerClass containerClass);
