@@ -102,10 +102,16 @@ function(zor_program name)
     target_link_options(${name} PRIVATE -Wl,-z,relro,-z,now $<$<CONFIG:Release>:-static-libstdc++;-static-libgcc>)
 endfunction()
 
-# zor_test(area LINK libs...): every tests/<area>/*Test.cc in one GoogleTest program named zor_<area>_tests.
+# zor_test(area [DIR dirs...] LINK libs...): every tests/<area>/*.cc, or those of the folders, in one GoogleTest program
+# named zor_<area>_tests.
 function(zor_test area)
-    cmake_parse_arguments(ARG "" "" "LINK" ${ARGN})
-    file(GLOB sources CONFIGURE_DEPENDS ${CMAKE_CURRENT_SOURCE_DIR}/${area}/*.cc)
+    cmake_parse_arguments(ARG "" "" "DIR;LINK" ${ARGN})
+    if(NOT ARG_DIR)
+        set(ARG_DIR ${area})
+    endif()
+    list(TRANSFORM ARG_DIR APPEND /*.cc)
+    list(TRANSFORM ARG_DIR PREPEND ${CMAKE_CURRENT_SOURCE_DIR}/)
+    file(GLOB sources CONFIGURE_DEPENDS ${ARG_DIR})
     if(NOT sources)
         return()
     endif()

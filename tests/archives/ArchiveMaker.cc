@@ -20,43 +20,24 @@ void check(archive* made, la_int64_t result) {
         throw std::runtime_error(std::string("archive: ") + ::archive_error_string(made));
 }
 
-int formatOf(Form form) {
-    switch (form) {
-    case Form::zip:
-        return ARCHIVE_FORMAT_ZIP;
-    case Form::cpio:
-        return ARCHIVE_FORMAT_CPIO_SVR4_NOCRC;
-    case Form::sevenZip:
-        return ARCHIVE_FORMAT_7ZIP;
-    case Form::gnuTar:
-        return ARCHIVE_FORMAT_TAR_GNUTAR;
-    default:
-        return ARCHIVE_FORMAT_TAR_PAX_RESTRICTED;
-    }
-}
-
-int filterOf(Form form) {
-    switch (form) {
-    case Form::tarGzip:
-        return ARCHIVE_FILTER_GZIP;
-    case Form::tarBzip2:
-        return ARCHIVE_FILTER_BZIP2;
-    case Form::tarCompress:
-        return ARCHIVE_FILTER_COMPRESS;
-    case Form::tarLz4:
-        return ARCHIVE_FILTER_LZ4;
-    case Form::tarLzip:
-        return ARCHIVE_FILTER_LZIP;
-    case Form::tarLzma:
-        return ARCHIVE_FILTER_LZMA;
-    case Form::tarXz:
-        return ARCHIVE_FILTER_XZ;
-    case Form::tarZstd:
-        return ARCHIVE_FILTER_ZSTD;
-    default:
-        return ARCHIVE_FILTER_NONE;
-    }
-}
+struct FormParts {
+    int format = ARCHIVE_FORMAT_TAR_PAX_RESTRICTED;
+    int filter = ARCHIVE_FILTER_NONE;
+};
+/// In the order of Form.
+constexpr FormParts parts[] = {{},
+                               {.format = ARCHIVE_FORMAT_TAR_GNUTAR},
+                               {.filter = ARCHIVE_FILTER_GZIP},
+                               {.filter = ARCHIVE_FILTER_BZIP2},
+                               {.filter = ARCHIVE_FILTER_COMPRESS},
+                               {.filter = ARCHIVE_FILTER_LZ4},
+                               {.filter = ARCHIVE_FILTER_LZIP},
+                               {.filter = ARCHIVE_FILTER_LZMA},
+                               {.filter = ARCHIVE_FILTER_XZ},
+                               {.filter = ARCHIVE_FILTER_ZSTD},
+                               {.format = ARCHIVE_FORMAT_ZIP},
+                               {.format = ARCHIVE_FORMAT_CPIO_SVR4_NOCRC},
+                               {.format = ARCHIVE_FORMAT_7ZIP}};
 
 la_ssize_t append(archive* /*made*/, void* bytes, const void* buffer, std::size_t count) {
     static_cast<std::string*>(bytes)->append(static_cast<const char*>(buffer), count);
@@ -68,8 +49,8 @@ la_ssize_t append(archive* /*made*/, void* bytes, const void* buffer, std::size_
 std::string makeArchive(Form form, const std::vector<Made>& entries) {
     std::string bytes;
     const std::unique_ptr<archive, Freed> made(::archive_write_new());
-    check(made.get(), ::archive_write_set_format(made.get(), formatOf(form)));
-    check(made.get(), ::archive_write_add_filter(made.get(), filterOf(form)));
+    check(made.get(), ::archive_write_set_format(made.get(), parts[static_cast<std::size_t>(form)].format));
+    check(made.get(), ::archive_write_add_filter(made.get(), parts[static_cast<std::size_t>(form)].filter));
     ::archive_write_set_bytes_in_last_block(made.get(), 1);
     check(made.get(), ::archive_write_open(made.get(), &bytes, nullptr, append, nullptr));
     for (const Made& wanted : entries) {

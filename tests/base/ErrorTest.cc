@@ -1,11 +1,13 @@
 // SPDX-License-Identifier: Apache-2.0
-// Error values and their one line, the level gate, the limit on provoked lines, and the boundary where exceptions end.
+// Error values and their one line, the level gate, the boundary where exceptions end, names that are encoded.
+#include "base/Format.h"
 #include "base/ZORException.h"
 #include "device/FileCrashAnnotation.h"
 #include "os/LinuxDisk.h"
 #include "os/Names.h"
 #include "support/FileTree.h"
 #include "support/RecordingLog.h"
+#include "support/SettableRoles.h"
 
 #include <csignal>
 #include <filesystem>
@@ -22,23 +24,18 @@ namespace {
 
 using support::LogLine;
 
-// One line exactly when it is asked for, with the place and the cause.
+// One line exactly when it is asked for, with the place and the cause; a system's number never passes for a code.
 TEST(Error, IsLoggedOnceWhereItIsMade) {
     const ZORError cause = posixError({"rename", 7}, ENOENT, "rename of %s failed", "/a");
     support::RecordingLog sink(logLevelNotice);
     const Log log(sink);
     for (const LogFlag flag : {LogFlag::no, LogFlag::yes})
-        for (const ZORError* underlying : {static_cast<const ZORError*>(nullptr), &cause})
-            EXPECT_TRUE(makeError(log, {"operation", 42}, ErrorCode::moveToLiveFailed, underlying, flag, "moving %d", 5)
-                            .is(ErrorCode::moveToLiveFailed));
-    EXPECT_EQ(sink.take(), (std::vector<LogLine>{{3, "operation", "42: moving 5"},
-                                                 {3, "operation", "42: moving 5 (POSIX 2 \"rename of /a failed\")"}}));
-    const ZORError bare({"operation", 42}, ErrorDomain::zor, -3, std::nullopt);
-    EXPECT_FALSE(bare.description());
-    EXPECT_EQ(static_cast<std::uint64_t>(bare.replyCode()), 0xFFFF'FFFF'FFFF'FFFDU);
-    EXPECT_EQ(posixError(ZOR_HERE, EPERM, "x").replyCode(), static_cast<ErrorCode>(EACCES)); // 1 would say success
-    EXPECT_EQ(posixError(ZOR_HERE, EAGAIN, "x").replyCode(), static_cast<ErrorCode>(1000 + EAGAIN)); // 11 is a code
-    EXPECT_EQ(posixError(ZOR_HERE, ENOTEMPTY, "x").replyCode(), static_cast<ErrorCode>(ENOTEMPTY));
+        EXPECT_TRUE(makeError(log, {"operation", 42}, ErrorCode::moveToLiveFailed, &cause, flag, "moving %d", 5)
+                        .is(ErrorCode::moveToLiveFailed));
+    EXPECT_EQ(sink.take(), (std::vector<LogLine>{{3, "operation", "42: moving 5 (POSIX 2 \"rename of /a failed\")"}}));
+    for (const auto& [number, code] : {std::pair(EPERM, EACCES), {EAGAIN, 1000 + EAGAIN}, {ENOTEMPTY, ENOTEMPTY}})
+        EXPECT_EQ(posixError(ZOR_HERE, number, "x").replyCode(),
+                  static_cast<ErrorCode>(code)); // 1 is success, 11 a code
     EXPECT_FALSE(cause.is(static_cast<ErrorCode>(2)));
 }
 
@@ -53,37 +50,6 @@ TEST(Log, LevelGate) {
         EXPECT_EQ(evaluated, written) << handleLevel;
         EXPECT_EQ(sink.take().size(), evaluated.size()) << handleLevel;
     }
-}
-
-class Build final : public platform::InternalBuildQuery {
-public:
-    explicit Build(bool internal) : internal_(internal) {}
-    [[nodiscard]] bool isInternalBuild() const override { return internal_; }
-
-private:
-    const bool internal_;
-};
-
-class NoAnnotation final : public platform::CrashAnnotation {
-public:
-    void record(std::string_view) override { ADD_FAILURE() << "a crash was recorded"; }
-};
-
-// An exception becomes error 40 under the operation's name; anything that is none passes through.
-TEST(ExceptionBoundary, TurnsExceptionsIntoError40) {
-    support::RecordingLog sink(logLevelNotice);
-    const Log log(sink);
-    const Build build(false);
-    NoAnnotation annotation;
-    ExceptionBoundary boundary(log, build, annotation);
-
-    const auto own = boundary.run({"lookup", 2}, []() -> Result<int> { throw ZORException("Range", "5 beyond 4"); });
-    EXPECT_TRUE(!own && own.error().is(ErrorCode::exceptionCaught));
-    const auto lines = sink.take(3, "lookup");
-    ASSERT_EQ(lines.size(), 1U);
-    EXPECT_TRUE(lines[0].starts_with("2: Got exception: Range: 5 beyond 4 : ")) << lines[0];
-    struct NoException {};
-    EXPECT_THROW((void)boundary.run({"lookup", 4}, []() -> Result<int> { throw NoException(); }), NoException);
 }
 
 // On an internal build the process dies with the first report in its file: a child whose threads all fail at once.
@@ -101,7 +67,7 @@ TEST(ExceptionBoundary, AnInternalBuildAbortsWithTheFirstReport) {
         platform::FileCrashAnnotation annotation(*root, disk);
         support::RecordingLog sink(logLevelNotice);
         const Log log(sink);
-        const Build build(true);
+        const support::SettableBuild build(true);
         ExceptionBoundary boundary(log, build, annotation);
         std::vector<std::jthread> threads;
         for (int i = 0; i < 4; ++i)
@@ -121,6 +87,25 @@ TEST(ExceptionBoundary, AnInternalBuildAbortsWithTheFirstReport) {
                                    "Exception: <worker> Range: 5 beyond 4\nStack:\n"))
         << report;
     EXPECT_EQ(report.find("INTERNAL ERROR", 5), std::string::npos) << "a second report was written";
+}
+
+// Any string is one visible path component, and no two are the same.
+TEST(PercentEncoding, IsOneComponentAndReversible) {
+    const std::pair<std::string, const char*> cases[] = {
+        {"com.veltra.App-1_b", "com.veltra.App-1_b"},
+        {"..", "%2E."},
+        {"a/b", "a%2Fb"},
+        {"%2E", "%252E"},
+        {"\xc3\xa9", "%C3%A9"},
+        {"a b\n", "a%20b%0A"},
+        {std::string("\0", 1), "%00"},
+    };
+    for (const auto& [text, encoded] : cases) {
+        EXPECT_EQ(platform::percentEncode(text), encoded);
+        EXPECT_EQ(platform::percentDecode(encoded), text);
+    }
+    for (const char* wrong : {"%", "%2", "%2e", "%GG", ".x", "a/b", "%41", "a b"})
+        EXPECT_EQ(platform::percentDecode(wrong), std::nullopt) << wrong;
 }
 
 } // namespace

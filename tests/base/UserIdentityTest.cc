@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
-// Whose containers a request may act on, as tables over every class; the lookup of the mobile user by many threads at
-// once.
+// Whose containers a request may act on, as a table; the lookup of the mobile user by many threads at once.
 #include "base/UserIdentity.h"
 #include "support/RecordingLog.h"
+#include "support/Waiting.h"
 
 #include <atomic>
 #include <cerrno>
@@ -15,7 +15,7 @@ namespace {
 
 class CountingPasswords final : public platform::PasswordDatabase {
 public:
-    explicit CountingPasswords(std::optional<std::uint32_t> mobile) : mobile_(mobile) {}
+    explicit CountingPasswords(std::uint32_t mobile) : mobile_(mobile) {}
     [[nodiscard]] std::expected<platform::PasswordEntry, int> entryForUserId(std::uint32_t) const override {
         return std::unexpected(ENOENT);
     }
@@ -24,32 +24,16 @@ public:
         std::this_thread::sleep_for(std::chrono::milliseconds(5));
         if (failure != 0)
             return std::unexpected(failure);
-        if (name != "mobile" || !mobile_)
+        if (name != "mobile")
             return std::unexpected(ENOENT);
-        return platform::PasswordEntry{.name = "mobile", .uid = *mobile_, .homeDirectory = "/private/var/mobile"};
+        return platform::PasswordEntry{.name = "mobile", .uid = mobile_, .homeDirectory = "/private/var/mobile"};
     }
     mutable std::atomic<int> lookups{0};
     int failure = 0;
 
 private:
-    const std::optional<std::uint32_t> mobile_;
+    const std::uint32_t mobile_;
 };
-
-// Each class accepts exactly its owners, of the ids next to every bound.
-TEST(UserIdentity, EachClassHasItsOwners) {
-    for (std::uint64_t number = 0; number <= 15; ++number) {
-        const bool bundle = number == 1 || number == 3 || number == 5 || number == 8;
-        const bool system = number == 12 || number == 13;
-        const bool perUser = !bundle && number >= 2 && number <= 11;
-        for (const std::uint32_t id : {0U, 1U, 32U, 33U, 34U, 498U, 499U, 500U, 501U, 510U, 511U, 4294967295U})
-            EXPECT_EQ(userIdIsValidForClass(static_cast<ContainerClass>(number), id),
-                      bundle   ? id == 33
-                      : system ? id == 499
-                               : perUser && id >= 501 && id <= 510)
-                << number << " " << id;
-    }
-    EXPECT_FALSE(userIdIsValidForClass(static_cast<ContainerClass>((std::uint64_t{1} << 32) + 2), 501));
-}
 
 // The first matching rule decides: the resolved user, or none for error 38 and its one line.
 TEST(UserIdentity, RequestsResolveByClassAndClient) {
@@ -92,6 +76,8 @@ TEST(UserIdentity, RequestsResolveByClassAndClient) {
         {1, 99, 777, 777},
         {777, 2, 777, 777},
         {507, 7, 501, {}},
+        // A class of more than 32 bits is none of these.
+        {501, (std::uint64_t{1} << 32) + 2, 0, {}},
     };
     for (const Row& row : rows) {
         support::RecordingLog sink(logLevelNotice);
@@ -114,38 +100,23 @@ TEST(UserIdentity, RequestsResolveByClassAndClient) {
     }
 }
 
-// Many threads ask at once: with the account one lookup for ever, without it one for each, and it is said once.
-TEST(UserIdentity, TheMobileUserIsLookedUpOnce) {
-    for (const auto& account : {std::optional<std::uint32_t>(501), std::optional<std::uint32_t>()}) {
-        support::RecordingLog sink(logLevelNotice);
-        const Log log(sink);
-        const CountingPasswords passwords(account);
-        UserIdentity users(log, passwords);
-        std::atomic<int> agreeing{0};
-        std::vector<std::jthread> threads;
-        for (int i = 0; i < 8; ++i)
-            threads.emplace_back([&] { agreeing += users.getCurrentMobileUserId() == account.value_or(0) ? 1 : 0; });
-        threads.clear();
-        EXPECT_EQ(agreeing, 8);
-        EXPECT_EQ(passwords.lookups, account ? 1 : 8);
-        const char* message = account ? "Current mobile user ID is 501" : "Failed to get mobile uid. This is bad";
-        EXPECT_EQ(sink.take(), (std::vector<support::LogLine>{{3, "__getCurrentMobileUserId_block_invoke", message}}));
-    }
-}
-
-// An account that was not found may be there the next time, whatever kept it from being found.
-TEST(UserIdentity, AMissingAccountIsNoAnswer) {
-    for (const int failure : {EMFILE, ENOMEM, EIO, ENOENT}) {
-        support::RecordingLog sink(logLevelNotice);
-        const Log log(sink);
-        CountingPasswords passwords(501);
-        UserIdentity users(log, passwords);
+// Many threads ask at once: an account is looked up once, for ever; where it was not found, whatever kept it from being
+// found, each asks again, for it may be there the next time.
+TEST(UserIdentity, TheMobileUserIsLookedUpUntilItIsFound) {
+    support::RecordingLog sink(logLevelNotice);
+    const Log log(sink);
+    CountingPasswords passwords(501);
+    UserIdentity users(log, passwords);
+    for (const int failure : {EMFILE, ENOMEM, EIO, ENOENT, 0, 0}) {
         passwords.failure = failure;
-        EXPECT_EQ(users.getCurrentMobileUserId(), 0U);
-        passwords.failure = 0;
-        EXPECT_EQ(users.getCurrentMobileUserId(), 501U) << failure;
-        EXPECT_EQ(passwords.lookups, 2) << failure;
+        const int before = passwords.lookups;
+        std::atomic<int> agreeing{0};
+        support::inThreads(
+            8, [&](unsigned) { agreeing += users.getCurrentMobileUserId() == (failure == 0 ? 501U : 0U) ? 1 : 0; });
+        EXPECT_EQ(agreeing, 8) << failure;
+        EXPECT_EQ(passwords.lookups - before, failure == 0 ? before == 32 : 8) << failure;
     }
+    EXPECT_EQ(sink.take().size(), 2U) << "each of both is said once";
 }
 
 } // namespace

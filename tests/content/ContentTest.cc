@@ -9,6 +9,7 @@
 #include "os/LinuxDisk.h"
 #include "support/FaultLoop.h"
 #include "support/FileTree.h"
+#include "support/Files.h"
 #include "support/HangingFileSystem.h"
 #include "support/LongRun.h"
 #include "support/PowerCut.h"
@@ -44,16 +45,14 @@ namespace zorvanectl::content::test {
 namespace {
 
 using zor::platform::FileDescriptor;
+using zor::support::readFile;
+using zor::support::writeFile;
 
 using namespace zor::test;
 constexpr const char* metadata = ".com.veltra.zorvane.metadata.plist";
 constexpr uid_t ownerId = 501;
 
 volatile std::sig_atomic_t noSignal = 0;
-
-void writeFile(const std::string& path, const std::string& bytes) {
-    std::ofstream(path, std::ios::binary) << bytes;
-}
 
 std::string repeated(const std::string& text, int count) {
     std::string whole;
@@ -252,9 +251,7 @@ TEST(Content, GoodArchives) {
         ASSERT_TRUE(outcome) << outcome.error().what;
         EXPECT_FALSE(world.isDamaged());
         for (const auto& [name, content] : contents) {
-            std::ifstream stream(world.path("/container/") + name, std::ios::binary);
-            const std::string read{std::istreambuf_iterator<char>(stream), {}};
-            EXPECT_TRUE(stream && read == content) << name;
+            EXPECT_TRUE(readFile(world.path("/container/") + name) == content) << name;
         }
         EXPECT_EQ(world.statusOf("a").st_mode & 07777, 0700U) << "its owner may use each of the directories";
         const struct stat file = world.statusOf("a/f");
@@ -416,9 +413,7 @@ TEST(Content, OperandsThatOthersHold) {
         const FileDescriptor container(::open(target.path("/container").c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
         if (!putContent(disk, container.get(), *source, {}, noSignal))
             continue;
-        std::string read;
-        std::getline(std::ifstream(target.path("/container/open")), read);
-        EXPECT_NE(read, "SECRET");
+        EXPECT_NE(readFile(target.path("/container/open")), "SECRET");
     }
     ends = true;
     swapping.join();
@@ -529,13 +524,12 @@ TEST(Content, ADecoderHoldsNothing) {
         descriptors.insert(entry.path().filename());
     EXPECT_EQ(descriptors, (std::set<std::string>{"3", "4"}));
     EXPECT_EQ(std::to_string(::getsid(std::stoi(pid))), pid) << "its caller's session, and terminal";
-    std::ostringstream status;
-    status << std::ifstream(process + "/status").rdbuf();
+    const std::string status = readFile(process + "/status");
     std::vector<std::string> lines = {"NoNewPrivs:\t1\n", "Seccomp:\t2\n"};
     if (::geteuid() == 0)
         lines.insert(lines.end(), {"Uid:\t65534\t65534\t65534\t65534\n", "CapPrm:\t0000000000000000\n"});
     for (const std::string& line : lines)
-        EXPECT_NE(status.str().find(line), std::string::npos) << line;
+        EXPECT_NE(status.find(line), std::string::npos) << line;
 }
 
 /// A step that is not to succeed.

@@ -1,17 +1,15 @@
 // SPDX-License-Identifier: Apache-2.0
 // Goal: a removal takes the whole tree and nothing else, says what it could not take, and never calls a failure a
-// success. Method: real trees with immutable items, mounts of failures by a failing disk, and an owner who moves things
-// about.
+// success. Method: real trees with immutable items, and names that come meanwhile.
 #include "fs/RecursiveRemove.h"
 
 #include "fs/TreeWorld.h"
-#include "support/FaultLoop.h"
+#include "support/FaultDisk.h"
 #include "support/ProcessResources.h"
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <linux/fs.h>
-#include <memory>
 #include <sys/ioctl.h>
 #include <unistd.h>
 
@@ -185,80 +183,6 @@ TEST(RemoveTree, RemovesWhatIsAddedMeanwhile) {
     EXPECT_EQ(removeTree(disk, world.fd(), "tree"), 0);
     EXPECT_FALSE(exists(world.fd(), "tree"));
     EXPECT_EQ(world.damage(), "");
-}
-
-// Every call failing in turn: said and returned, the rest of the tree gone, no descriptor kept, and a second try
-// succeeds.
-TEST(RemoveTree, SaysEveryFailure) {
-    const support::ProcessResources before;
-    const auto report = support::forEachFaultPoint(
-        *std::make_unique<platform::LinuxDisk>(), {.error = EIO},
-        [](support::FaultDisk& disk) {
-            struct Prepared {
-                std::unique_ptr<World> world;
-                support::FaultDisk* disk;
-                int result = 0;
-            };
-            Prepared prepared{.world = std::make_unique<World>(), .disk = &disk};
-            makeItems(prepared.world->fd(), {"tree/", "tree/a/", "tree/a/b/", "tree/c/", "tree/f", "tree/a/f",
-                                             "tree/a/b/f", "tree/a/b/g", "tree/c/f"});
-            return prepared;
-        },
-        [](auto& prepared) { prepared.result = removeTree(*prepared.disk, prepared.world->fd(), "tree"); },
-        [](auto& prepared, const support::FaultOutcome& outcome) -> std::string {
-            if (prepared.result != (outcome.met ? -EIO : 0))
-                return "returned " + std::to_string(prepared.result);
-            if (exists(prepared.world->fd(), "tree") != outcome.met)
-                return "the tree is " + std::string(outcome.met ? "gone" : "still there");
-            if (outcome.met && removeTree(prepared.world->disk, prepared.world->fd(), "tree") != 0)
-                return "a second try fails";
-            return prepared.world->damage();
-        });
-    EXPECT_EQ(report.complaint, "");
-    EXPECT_EQ(report.examined, 10U);
-    EXPECT_EQ(before.leakedSince(), "");
-}
-
-// An item that stays is told once, and so are the directories that stay because of it; stop ends the removal there.
-TEST(RemoveTree, TellsWhatStaysOnce) {
-    World world;
-    for (const RemoveAnswer answer : {RemoveAnswer::proceed, RemoveAnswer::stop}) {
-        makeItems(world.fd(), {"tree/", "tree/a/", "tree/a/b/", "tree/a/b/f"});
-        support::FaultDisk disk(world.disk);
-        disk.arm(
-            {.error = EACCES, .span = support::FaultSpan::fromThenOn, .filter = [](const support::DiskCallInfo& info) {
-                 return info.call == support::DiskCall::unlinkFile;
-             }});
-        Said said;
-        const bool stops = answer == RemoveAnswer::stop;
-        EXPECT_EQ(removeTree(disk, world.fd(), "tree", said.callbacks(answer)), stops ? -EACCES : 0);
-        EXPECT_EQ(said.text, stops ? "a/b/f:13 " : "a/b/f:13 a/b:39 a:39 :39 ");
-        EXPECT_EQ(removeTree(world.disk, world.fd(), "tree"), 0);
-    }
-}
-
-// An owner who moves directories about all the time, and puts links in their place: nothing outside goes, and the tree
-// can be removed as soon as he is done.
-TEST(RemoveTree, StaysInATreeThatIsMovedAbout) {
-    World world;
-    const bool permitted = world.confined([&] {
-        const std::size_t descriptorsBefore = openDescriptorCount();
-        const std::size_t removals = repeatForRace([&] {
-            world.makeTree();
-            {
-                const Vandal vandal(world);
-                removeTree(world.disk, world.fd(), "tree");
-            }
-            removeTree(world.disk, world.fd(), "tree");
-            removeTree(world.disk, world.fd(), "outside/parking/moved");
-            EXPECT_FALSE(exists(world.fd(), "tree"));
-            EXPECT_EQ(world.damage(), "");
-        });
-        EXPECT_GT(removals, 3U);
-        EXPECT_EQ(openDescriptorCount(), descriptorsBefore);
-    });
-    if (!permitted)
-        GTEST_SKIP() << "chroot is not permitted";
 }
 
 } // namespace

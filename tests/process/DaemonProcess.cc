@@ -3,14 +3,13 @@
 
 #include "device/SemaphoreBootMarker.h"
 #include "os/SystemRoot.h"
+#include "support/TestRoot.h"
 
 #include <chrono>
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
-#include <fstream>
-#include <sstream>
 #include <thread>
 #include <unistd.h>
 
@@ -31,18 +30,6 @@ zorvane::Client::Lookup dataContainer(const std::string& identifier, bool transi
             .transient = transient};
 }
 
-void writeFile(const std::string& path, const std::string& bytes, mode_t mode) {
-    std::filesystem::create_directories(std::filesystem::path(path).parent_path());
-    std::ofstream(path, std::ios::binary) << bytes;
-    ::chmod(path.c_str(), mode);
-}
-
-std::string readFile(const std::string& path) {
-    std::ostringstream text;
-    text << std::ifstream(path).rdbuf();
-    return text.str();
-}
-
 std::vector<std::string> toolWords(const std::string& root, const std::vector<std::string>& words) {
     std::vector<std::string> all = {programPath("zorvanectl"), "--root", root};
     all.insert(all.end(), words.begin(), words.end());
@@ -51,16 +38,7 @@ std::vector<std::string> toolWords(const std::string& root, const std::vector<st
 
 DaemonProcess::DaemonProcess(Syncs syncs, const std::string& parent) : directory_(parent), syncs_(syncs) {
     ::chmod(root().c_str(), 0755);
-    std::filesystem::create_directories(path("tmp"));
-    writeFile(path("etc/passwd"), "root:x:0:0::/private/var/root:/bin/sh\n"
-                                  "mobile:x:501:501::/private/var/mobile:/bin/sh\n"
-                                  "second:x:502:502::/private/var/second:/bin/sh\n");
-    for (const auto& [home, user] : {std::pair("mobile", 501U), {"second", 502U}, {"brevad", 33U}}) {
-        const std::string directory = path("private/var/") + home;
-        std::filesystem::create_directories(directory);
-        if (::geteuid() == 0)
-            (void)!::chown(directory.c_str(), user, user);
-    }
+    support::furnish(root());
     registerProgram("10-tests", ownProgram(), everyPower);
     registerProgram("20-ctl", programPath("zorvanectl"), everyPower);
 }

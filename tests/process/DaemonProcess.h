@@ -4,6 +4,7 @@
 
 #include "process/Program.h"
 #include "support/FileTree.h"
+#include "support/Files.h"
 #include "zorvane/Client.h"
 
 #include <string>
@@ -66,7 +67,7 @@ private:
 /// A data container of user 501's that is made where it is missing.
 zorvane::Client::Lookup dataContainer(const std::string& identifier, bool transient = false);
 
-void writeFile(const std::string& path, const std::string& bytes, mode_t mode = 0644);
-std::string readFile(const std::string& path);
+using support::readFile;
+using support::writeFile;
 
 } // namespace zor::whole

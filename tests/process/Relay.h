@@ -4,15 +4,12 @@
 #pragma once
 
 #include "ipc/Keys.h"
-#include "os/FileDescriptor.h"
 #include "process/DaemonProcess.h"
-
-#include <functional>
-#include <thread>
+#include "support/FakeServer.h"
 
 namespace zor::whole {
 
-class Relay {
+class Relay : public support::FakeServer {
 public:
     enum class Fate {
         passedOn,
@@ -23,20 +20,6 @@ public:
     /// Called by a thread for each connection.
     using Judge = std::function<Fate(ipc::Command)>;
     Relay(const DaemonProcess& daemon, Judge judge);
-    /// Waits for the clients to go.
-    ~Relay();
-    Relay(const Relay&) = delete;
-    Relay& operator=(const Relay&) = delete;
-    [[nodiscard]] std::string root() const { return place_.path(); }
-
-private:
-    void serve(int client) const;
-
-    const support::TemporaryDirectory place_;
-    const std::string daemon_;
-    const Judge judge_;
-    platform::FileDescriptor listening_;
-    std::thread acceptor_;
 };
 
 } // namespace zor::whole

@@ -1,8 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "support/FaultDisk.h"
+#include "support/FaultLoop.h"
 
 #include <cstring>
 #include <exception>
+#include <iterator>
+#include <sys/wait.h>
 #include <unistd.h>
 
 namespace zor::support {
@@ -82,6 +84,41 @@ int FaultDisk::write(int fd, std::span<const std::uint8_t> bytes) {
         return result;
     return static_cast<int>(
         intercept({DiskCall::write, "(second half)", fd}, [&] { return inner().write(fd, bytes.subspan(half)); }));
+}
+
+const char* nameOf(DiskCall call) {
+    static constexpr const char* names[] = {"makeDirectory", "createFile",     "makeSymbolicLink", "makeHardLink",
+                                            "makeFifo",      "rename",         "unlinkFile",       "removeDirectory",
+                                            "changeMode",    "changeOwner",    "setTimes",         "setAttribute",
+                                            "setInodeFlags", "write",          "cloneData",        "copyData",
+                                            "sync",          "syncFileSystem", "orderData"};
+    static_assert(std::size(names) == static_cast<std::size_t>(DiskCall::orderData) + 1);
+    return names[static_cast<std::size_t>(call)];
+}
+
+std::string DiskCallInfo::describe() const {
+    return subject.empty() ? nameOf(call) : std::string(nameOf(call)) + " " + subject;
+}
+
+std::string FaultOutcome::describe() const {
+    std::string text = fault.describe();
+    if (!met)
+        return text + " (not met)";
+    return call.empty() ? text : text + " at " + call;
+}
+
+std::string waitForFaultChild(pid_t child, bool& met) {
+    int status = 0;
+    while (child > 0 && ::waitpid(child, &status, 0) < 0) {
+        if (errno != EINTR)
+            return "waitpid failed";
+    }
+    if (child < 0)
+        return "fork failed";
+    if (WIFSIGNALED(status))
+        return "the child ended by signal " + std::to_string(WTERMSIG(status));
+    met = WEXITSTATUS(status) == FaultDisk::exitStatus;
+    return met || WEXITSTATUS(status) == 0 ? "" : "the child ended with " + std::to_string(WEXITSTATUS(status));
 }
 
 } // namespace zor::support

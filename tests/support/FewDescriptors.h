@@ -10,22 +10,31 @@
 
 namespace zor::support {
 
-/// Takes all descriptors of this process but some.
-class FewDescriptors {
+/// The soft limit on this process's descriptors, put back at the end.
+class DescriptorLimit {
 public:
-    explicit FewDescriptors(rlim_t left) {
-        ::getrlimit(RLIMIT_NOFILE, &before_);
-        const int lowest = ::open("/dev/null", O_RDONLY | O_CLOEXEC);
-        ::close(lowest);
-        const rlimit few{static_cast<rlim_t>(lowest) + left, before_.rlim_max};
-        ::setrlimit(RLIMIT_NOFILE, &few);
+    DescriptorLimit() { ::getrlimit(RLIMIT_NOFILE, &before_); }
+    ~DescriptorLimit() { ::setrlimit(RLIMIT_NOFILE, &before_); }
+    DescriptorLimit(const DescriptorLimit&) = delete;
+    DescriptorLimit& operator=(const DescriptorLimit&) = delete;
+    bool set(rlim_t count) const {
+        const rlimit limit = {.rlim_cur = count, .rlim_max = before_.rlim_max};
+        return ::setrlimit(RLIMIT_NOFILE, &limit) == 0;
     }
-    ~FewDescriptors() { ::setrlimit(RLIMIT_NOFILE, &before_); }
-    FewDescriptors(const FewDescriptors&) = delete;
-    FewDescriptors& operator=(const FewDescriptors&) = delete;
+    [[nodiscard]] rlim_t hard() const { return before_.rlim_max; }
 
 private:
     rlimit before_{};
+};
+
+/// Takes all descriptors of this process but some.
+class FewDescriptors : public DescriptorLimit {
+public:
+    explicit FewDescriptors(rlim_t left) {
+        const int lowest = ::open("/dev/null", O_RDONLY | O_CLOEXEC);
+        ::close(lowest);
+        set(static_cast<rlim_t>(lowest) + left);
+    }
 };
 
 /// The same limit, there for a moment and gone for a moment, over and over, wherever the process is by then.

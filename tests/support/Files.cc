@@ -2,6 +2,9 @@
 #include "support/Files.h"
 
 #include <fcntl.h>
+#include <filesystem>
+#include <fstream>
+#include <iterator>
 #include <sys/stat.h>
 
 namespace zor::support {
@@ -55,6 +58,19 @@ void makeItems(int parent, const std::vector<std::string>& items) {
 bool exists(int parent, const std::string& path) {
     struct stat status{};
     return ::fstatat(parent, path.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0;
+}
+
+void writeFile(const std::string& path, std::string_view bytes, mode_t mode) {
+    std::filesystem::create_directories(std::filesystem::path(path).parent_path());
+    std::ofstream file(path, std::ios::trunc | std::ios::binary);
+    file << bytes;
+    file.close();
+    checked(file && ::chmod(path.c_str(), mode) == 0 ? 0 : -1, "write " + path);
+}
+
+std::string readFile(const std::string& path) {
+    std::ifstream file(path, std::ios::binary);
+    return {std::istreambuf_iterator<char>(file), {}};
 }
 
 } // namespace zor::support

@@ -9,6 +9,7 @@
 #include <cstdint>
 #include <span>
 #include <string>
+#include <string_view>
 #include <sys/types.h>
 #include <system_error>
 #include <vector>
@@ -32,6 +33,9 @@ void makeFifo(int parent, const std::string& path);
 /// "NAME/" a directory, "NAME -> TARGET" a link, "NAME|" a FIFO, anything else a file holding "x".
 void makeItems(int parent, const std::vector<std::string>& items);
 bool exists(int parent, const std::string& path);
+/// By paths, with the directories on the way; what a file holds is "" where there is none.
+void writeFile(const std::string& path, std::string_view bytes, mode_t mode = 0644);
+std::string readFile(const std::string& path);
 
 inline std::span<const std::uint8_t> bytesOf(const std::string& text) {
     return {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()};

@@ -3,23 +3,34 @@
 // what the kernel says, and raw clients that may send any bytes.
 #pragma once
 
-#include "ipc/Frame.h"
-#include "platform/TestRoot.h"
 #include "plist/Binary.h"
 #include "service/LinuxServiceListener.h"
+#include "support/FileTree.h"
+#include "support/Frames.h"
+#include "support/Waiting.h"
 
 #include <algorithm>
 #include <atomic>
 #include <cstring>
+#include <fcntl.h>
+#include <gtest/gtest.h>
 #include <mutex>
 #include <poll.h>
 #include <set>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
-#include <sys/un.h>
 #include <vector>
 
 namespace zor::platform {
+
+using support::addressOf;
+using support::connectTo;
+using support::eventually;
+using support::frameOf;
+using support::inThreads;
+using support::limitWaiting;
+using support::sendWithDescriptor;
 
 /// Peers as SO_PEERCRED tells them.
 class KernelIdentity final : public PeerIdentity {
@@ -92,41 +103,6 @@ private:
     FileDescriptor descriptor_;
 };
 
-inline sockaddr_un addressOf(const std::string& path) {
-    sockaddr_un address{.sun_family = AF_UNIX, .sun_path = {}};
-    path.copy(address.sun_path, sizeof address.sun_path - 1);
-    return address;
-}
-
-inline bool connectTo(int socket, const std::string& path) {
-    const sockaddr_un address = addressOf(path);
-    return ::connect(socket, reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
-}
-
-/// From now on calls give up after ten seconds.
-inline void limitWaiting(int socket) {
-    const timeval timeout = {.tv_sec = 10, .tv_usec = 0};
-    ::setsockopt(socket, SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof timeout);
-    ::setsockopt(socket, SOL_SOCKET, SO_SNDTIMEO, &timeout, sizeof timeout);
-}
-
-/// As one message with a descriptor attached.
-inline bool sendWithDescriptor(int socket, const plist::Data& bytes, int descriptor) {
-    iovec part = {.iov_base = const_cast<std::uint8_t*>(bytes.data()), .iov_len = bytes.size()};
-    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-    msghdr message = {};
-    message.msg_iov = &part;
-    message.msg_iovlen = 1;
-    message.msg_control = control;
-    message.msg_controllen = sizeof control;
-    cmsghdr* header = CMSG_FIRSTHDR(&message);
-    header->cmsg_level = SOL_SOCKET;
-    header->cmsg_type = SCM_RIGHTS;
-    header->cmsg_len = CMSG_LEN(sizeof(int));
-    std::memcpy(CMSG_DATA(header), &descriptor, sizeof descriptor);
-    return ::sendmsg(socket, &message, MSG_NOSIGNAL) == static_cast<ssize_t>(bytes.size());
-}
-
 inline void append(plist::Data& bytes, const plist::Data& more) {
     bytes.insert(bytes.end(), more.begin(), more.end());
 }
@@ -135,25 +111,13 @@ inline plist::Data partOf(const plist::Data& bytes, std::size_t begin, std::size
     return {bytes.data() + begin, bytes.data() + end};
 }
 
-/// One whole frame.
-inline plist::Data frameOf(std::uint32_t length, std::uint32_t flags, std::uint64_t id, const plist::Data& payload) {
-    plist::Data frame(ipc::frameHeaderBytes);
-    ipc::encodeFrameHeader({.payloadBytes = length, .flags = flags, .id = id},
-                           std::span(frame).first<ipc::frameHeaderBytes>());
-    append(frame, payload);
-    return frame;
-}
-
-inline plist::Data frameOf(const plist::Dictionary& message, std::uint64_t id,
-                           std::uint32_t flags = ipc::frameExpectsReply) {
-    const auto payload = plist::writeBinary(message);
-    return frameOf(static_cast<std::uint32_t>(payload->size()), flags, id, *payload);
-}
-
 /// A request with a number in it.
 inline plist::Dictionary numbered(std::uint64_t number) {
     return {{"Number", number}};
 }
+
+/// The request of a client that wants to know whether it is served.
+inline const plist::Dictionary question = {{"Question", true}};
 
 /// As many frames as that, numbered from 0 on, which are also their ids.
 inline plist::Data burstOf(std::uint64_t count, std::uint32_t flags = ipc::frameExpectsReply) {
@@ -177,24 +141,15 @@ public:
     }
     int socket() const { return socket_.get(); }
     /// False when the daemon's side has closed.
-    bool send(const plist::Data& bytes) {
-        return ::send(socket_.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL) == static_cast<ssize_t>(bytes.size());
-    }
+    bool send(const plist::Data& bytes) { return support::sendAll(socket_.get(), bytes); }
     bool send(const plist::Dictionary& message, std::uint64_t id) { return send(frameOf(message, id)); }
     /// nullopt at the end of the stream, on a reset, or when nothing comes.
     std::optional<Reply> receive() {
-        std::array<std::uint8_t, ipc::frameHeaderBytes> bytes;
-        if (!receiveAll(bytes))
-            return std::nullopt;
-        const ipc::FrameHeader header = ipc::decodeFrameHeader(bytes);
-        EXPECT_TRUE(header.isValidReply());
-        plist::Data payload(header.payloadBytes);
-        if (!receiveAll(payload))
-            return std::nullopt;
-        auto value = plist::readBinary(payload);
-        if (!value || !value->asDictionary())
-            return std::nullopt;
-        return Reply{.id = header.id, .message = std::move(*value->asMutableDictionary())};
+        const auto frame = support::receiveFrame(socket_.get());
+        if (!frame)
+            return {};
+        EXPECT_TRUE(frame->header.isValidReply());
+        return Reply{.id = frame->header.id, .message = frame->message()};
     }
     /// The same, when something comes within a few milliseconds.
     std::optional<Reply> receiveIfAny() {
@@ -213,14 +168,10 @@ public:
         return received == 0 || (received < 0 && errno == ECONNRESET);
     }
     /// A request that comes back, so the listener is alive for this client.
-    bool isServed() { return send(numbered(77), 4711) && receives(4711, numbered(77)); }
+    bool isServed() { return send(question, 4711) && receives(4711, question); }
     void close() { socket_.reset(); }
 
 private:
-    bool receiveAll(std::span<std::uint8_t> bytes) {
-        return ::recv(socket_.get(), bytes.data(), bytes.size(), MSG_WAITALL) == static_cast<ssize_t>(bytes.size());
-    }
-
     FileDescriptor socket_;
 };
 

@@ -1,25 +1,23 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "base/Format.h"
 #include "device/DeviceQueries.h"
 #include "device/FileCrashAnnotation.h"
 #include "device/FileDeviceLockState.h"
 #include "device/LinkSandboxUserState.h"
 #include "device/SemaphoreBootMarker.h"
 #include "device/XattrProtectionClass.h"
-#include "identity/LinuxPasswordDatabase.h"
-#include "os/DaemonLock.h"
 #include "os/EpollRunLoop.h"
 #include "os/Names.h"
-#include "os/Openat2.h"
-#include "platform/TestRoot.h"
+#include "support/FewDescriptors.h"
+#include "support/TestRoot.h"
+#include "support/Waiting.h"
 
 #include <atomic>
-#include <csignal>
 #include <cstring>
+#include <fcntl.h>
 #include <filesystem>
 #include <functional>
+#include <gtest/gtest.h>
 #include <span>
-#include <sys/file.h>
 #include <sys/wait.h>
 #include <sys/xattr.h>
 #include <unistd.h>
@@ -27,58 +25,18 @@
 namespace zor::platform {
 namespace {
 
-TEST(SystemRoot, MapsPathsAndRefusesARuntimeDirectoryOfOthers) {
-    const TestRoot test;
-    const SystemRoot& root = test.root();
-    EXPECT_FALSE(root.isDeviceRoot());
-    EXPECT_EQ(root.path("/private/var"), test.path("private/var"));
-    EXPECT_EQ(root.path("run/zorvane"), test.path("run/zorvane"));
-    EXPECT_EQ(root.path("/"), root.canonicalPath());
-    const SystemRoot device = SystemRoot::open("/usr/..").value();
-    EXPECT_TRUE(device.isDeviceRoot());
-    EXPECT_EQ(device.path("/private/var"), "/private/var");
-    EXPECT_EQ(device.path("/"), "/");
-    EXPECT_EQ(SystemRoot::open(test.path("absent")).error(), ENOENT);
+using support::eventually;
+using support::TestRoot;
 
-    LinuxDisk disk(Syncs::off);
-    ASSERT_EQ(::symlink(test.path("").c_str(), test.path("link").c_str()), 0);
-    SystemRoot again = SystemRoot::open(test.path("link")).value();
-    EXPECT_EQ(again.canonicalPath(), root.canonicalPath());
-    EXPECT_EQ(again.makeRuntimeDirectory(disk), 0);
-    ::chmod(test.path("run/zorvane").c_str(), 0775);
-    EXPECT_EQ(again.makeRuntimeDirectory(disk), EPERM);
-    ASSERT_EQ(::rename(test.path("run/zorvane").c_str(), test.path("run/elsewhere").c_str()), 0);
-    ASSERT_EQ(::symlink("elsewhere", test.path("run/zorvane").c_str()), 0);
-    EXPECT_NE(again.makeRuntimeDirectory(disk), 0);
-}
-
-// Mode and owner can be changed through a descriptor that cannot be read or written, and a link is not followed.
-TEST(LinuxDisk, ActsOnPathDescriptors) {
-    TestRoot test;
-    test.write("file", "x", 0600);
-    const auto mode = [&] { return std::filesystem::status(test.path("file")).permissions(); };
-    const auto file = openBeneath(test.root().descriptor(), "file", O_PATH).value();
-    EXPECT_EQ(test.disk().changeMode(file.get(), 0640), 0);
-    EXPECT_EQ(test.disk().changeOwner(file.get(), ::geteuid(), ::getegid()), 0);
-    EXPECT_EQ(mode(), std::filesystem::perms(0640));
-    ASSERT_EQ(::symlink("file", test.path("link").c_str()), 0);
-    const FileDescriptor link(::open(test.path("link").c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
-    EXPECT_NE(test.disk().changeMode(link.get(), 0777), 0);
-    EXPECT_EQ(mode(), std::filesystem::perms(0640));
-    EXPECT_EQ(test.disk().changeMode(-1, 0600), -EBADF);
-}
-
-TEST(SystemVersion, ReadsReleaseFiles) {
+TEST(DeviceQueries, ReadReleaseFiles) {
     const std::pair<const char*, const char*> cases[] = {
         {"BUILD_ID=21A42\nVERSION_ID=3\n", "21A42"},
         {"BUILD_ID=\"\"\nVERSION_ID='12 \"b\"'\n", "12 \"b\""},
         {"BUILD_ID=\"a\\\"b\\$c\\\\d\\n\"", "a\"b$c\\d\\n"},
         {"# BUILD_ID=comment\nXBUILD_ID=1\nBUILD_IDX=2\nVERSION_ID=7", "7"},
         {"BUILD_ID=\"open\n", "\"open"},
-        {"", ""},
     };
     const TestRoot test;
-    const std::string file = test.path(names::operatingSystemRelease);
     const auto version = [&] { return LinuxSystemVersionQuery(test.root()).buildVersion(); };
     for (const auto& [text, expected] : cases) {
         test.write(names::operatingSystemRelease, text);
@@ -86,46 +44,11 @@ TEST(SystemVersion, ReadsReleaseFiles) {
     }
     // A link in a tree that only root writes to counts, and ends below the root; a FIFO holds nobody up.
     test.write("usr/lib/os-release", "BUILD_ID=linked\n");
-    ::unlink(file.c_str());
-    ASSERT_EQ(::symlink("/usr/lib/os-release", file.c_str()), 0);
+    const std::string file = test.path(names::operatingSystemRelease);
+    ASSERT_EQ(::unlink(file.c_str()) | ::symlink("/usr/lib/os-release", file.c_str()), 0);
     EXPECT_EQ(version(), "linked");
-    ::unlink(file.c_str());
-    ASSERT_EQ(::mkfifo(file.c_str(), 0644), 0);
+    ASSERT_EQ(::unlink(file.c_str()) | ::mkfifo(file.c_str(), 0644), 0);
     EXPECT_EQ(version(), "");
-    EXPECT_FALSE(LinuxInternalBuildQuery(test.root()).isInternalBuild());
-    test.write(names::internalBuildMark, "");
-    EXPECT_TRUE(LinuxInternalBuildQuery(test.root()).isInternalBuild());
-}
-
-TEST(PasswordDatabase, ReadsTheRootsOwnFile) {
-    const TestRoot test;
-    const LinuxPasswordDatabase database(test.root());
-    EXPECT_FALSE(database.entryForUserId(0)) << "the system's own database must not be asked";
-    test.write(names::passwordFile, "root:x:0:0:root:/private/var/root:/bin/sh\n"
-                                    "# a comment\nbroken line\nmobile:x:501:501::/private/var/mobile:/bin/sh\n"
-                                    "homeless:x:502:502:::/bin/sh\nrelative:x:503:503::home:/bin/sh\n"
-                                    "other:x:501:501::/elsewhere:/bin/sh\n");
-    ASSERT_TRUE(database.entryForUserId(501));
-    EXPECT_EQ(database.entryForUserId(501)->name, "mobile");
-    EXPECT_EQ(database.entryForUserId(501)->homeDirectory, test.path("private/var/mobile"));
-    EXPECT_EQ(database.entryForName("other")->homeDirectory, test.path("elsewhere"));
-    for (const char* name : {"homeless", "relative", "absent", ""})
-        EXPECT_FALSE(database.entryForName(name)) << name;
-    // On the device itself the whole database of the system counts.
-    EXPECT_TRUE(LinuxPasswordDatabase(SystemRoot::open("/").value()).entryForUserId(0));
-}
-
-TEST(CrashAnnotation, KeepsTheLastMessageWhole) {
-    TestRoot test;
-    test.makeDirectories(names::logDirectory);
-    const std::string file = std::string(names::logDirectory) + "/" + names::crashFile;
-    FileCrashAnnotation crash(test.root(), test.disk());
-    crash.record("first");
-    EXPECT_EQ(test.read(file), "first");
-    // What a kill in the middle of an earlier record left is in nobody's way.
-    test.write(std::string(names::logDirectory) + "/." + names::crashFile, "half");
-    crash.record("second, longer");
-    EXPECT_EQ(test.read(file), "second, longer");
 }
 
 // The marker is per root, and only one of ours counts, not what others could plant. Each mark is judged without the
@@ -187,20 +110,24 @@ const std::string lockStateFile = std::string(names::runtimeDirectory) + "/" + n
 TEST(DeviceLockState, ReadsANumberOrNothing) {
     const TestRoot test;
     const FileDeviceLockState state(test.root());
+    const std::string file = test.path(lockStateFile);
     EXPECT_EQ(state.currentState(), 0);
-    for (const char* number : {"0", "1\n", "2", "-3\n"}) {
-        test.replace(lockStateFile, number);
-        EXPECT_EQ(state.currentState(), std::atoi(number));
+    for (const auto& [text, number] : {std::pair("0", 0),
+                                       {"1\n", 1},
+                                       {"2", 2},
+                                       {"-3\n", -3},
+                                       {"", -1},
+                                       {"1 ", -1},
+                                       {"one", -1},
+                                       {"1\n\n", -1},
+                                       {"99999999999", -1},
+                                       {"0x1", -1}}) {
+        test.replace(lockStateFile, text);
+        EXPECT_EQ(state.currentState(), number) << text;
     }
-    for (const char* wrong : {"", "1 ", "one", "1\n\n", "99999999999", "0x1"}) {
-        test.replace(lockStateFile, wrong);
-        EXPECT_EQ(state.currentState(), -1) << wrong;
-    }
-    ::unlink(test.path(lockStateFile).c_str());
-    ASSERT_EQ(::symlink("/etc/hostname", test.path(lockStateFile).c_str()), 0);
+    ASSERT_EQ(::unlink(file.c_str()) | ::symlink("/etc/hostname", file.c_str()), 0);
     EXPECT_EQ(state.currentState(), -1);
-    ::unlink(test.path(lockStateFile).c_str());
-    ASSERT_EQ(::mkfifo(test.path(lockStateFile).c_str(), 0644), 0);
+    ASSERT_EQ(::unlink(file.c_str()) | ::mkfifo(file.c_str(), 0644), 0);
     EXPECT_EQ(state.currentState(), -1);
 }
 
@@ -229,18 +156,13 @@ TEST(DeviceLockState, ForgetsWhatItKeptOfAFileThatChanges) {
     EXPECT_EQ(removed.state.currentState(), 4);
 }
 
-// Every change reaches the loop: rename, removal, writing in place; those of other files do not.
+// Every change reaches the loop: rename, removal, writing in place.
 TEST(DeviceLockState, TellsChanges) {
     const TestRoot test;
     EpollRunLoop loop;
     FileDeviceLockState state(test.root());
-    std::atomic<int> calls{0};
     std::atomic<int> seen{-2};
-    const auto changed = [&] {
-        seen = state.currentState();
-        ++calls;
-    };
-    ASSERT_EQ(state.registerForChanges(loop, changed), 0);
+    ASSERT_EQ(state.registerForChanges(loop, [&] { seen = state.currentState(); }), 0);
     std::thread runner([&] { loop.run(); });
     const auto sees = [&](int expected) { return eventually([&] { return seen == expected; }); };
     test.replace(lockStateFile, "1");
@@ -249,34 +171,8 @@ TEST(DeviceLockState, TellsChanges) {
     EXPECT_TRUE(sees(0));
     test.write(lockStateFile, "4");
     EXPECT_TRUE(sees(4));
-    test.replace(lockStateFile, "0");
-    EXPECT_TRUE(sees(0));
-    std::this_thread::sleep_for(std::chrono::milliseconds(20));
-    const int before = calls;
-    test.write(std::string(names::runtimeDirectory) + "/other", "x");
-    std::this_thread::sleep_for(std::chrono::milliseconds(50));
-    EXPECT_EQ(calls, before);
     loop.stop();
     runner.join();
-}
-
-// Any string is one visible path component, and no two are the same.
-TEST(PercentEncoding, IsOneComponentAndReversible) {
-    const std::pair<std::string, const char*> cases[] = {
-        {"com.veltra.App-1_b", "com.veltra.App-1_b"},
-        {"..", "%2E."},
-        {"a/b", "a%2Fb"},
-        {"%2E", "%252E"},
-        {"\xc3\xa9", "%C3%A9"},
-        {"a b\n", "a%20b%0A"},
-        {std::string("\0", 1), "%00"},
-    };
-    for (const auto& [text, encoded] : cases) {
-        EXPECT_EQ(percentEncode(text), encoded);
-        EXPECT_EQ(percentDecode(encoded), text);
-    }
-    for (const char* wrong : {"%", "%2", "%2e", "%GG", ".x", "a/b", "%41", "a b"})
-        EXPECT_EQ(percentDecode(wrong), std::nullopt) << wrong;
 }
 
 /// "" when there is no link.
@@ -327,13 +223,17 @@ TEST(SandboxUserState, RemovesDanglingMappings) {
     map("live", test.path("private/var/mobile/live"));
     map("gone", test.path("private/var/mobile/gone"));
     map("not.ours", "/usr");
-    map("beside", test.path("").substr(0, test.path("").size() - 1) + "private/var/mobile/live");
+    // A directory that is there, whose path only begins as the root's does.
+    const std::string beside = test.path() + "-beside";
+    ASSERT_EQ(::mkdir(beside.c_str(), 0755), 0);
+    map("beside", beside);
     const std::string directory = test.path("run/zorvane/sandbox/501/1/");
     ASSERT_EQ(::symlink("half", (directory + ".new-7").c_str()), 0);
     EXPECT_EQ(remove(), 0U);
     EXPECT_NE(linkTarget(directory + "gone"), "");
     mayConclude = true;
     EXPECT_EQ(remove(), 3U);
+    ::rmdir(beside.c_str());
     EXPECT_NE(linkTarget(directory + "live"), "");
     for (const char* name : {"gone", "not.ours", "beside", ".new-7"})
         EXPECT_EQ(linkTarget(directory + name), "") << name;
@@ -353,9 +253,10 @@ TEST(FileProtectionClass, RefusesWhatALockTakesAway) {
         GTEST_SKIP() << "this file system has no extended attributes";
     }
     EXPECT_TRUE(protection.supported());
+    constexpr int classes[] = {0, 1, 2, 3, 4, 5, 258}; // the last is no 2
     for (const int state : {0, 1, 2, -1}) {
-        for (int from = 0; from <= 5; ++from) {
-            for (int to = 0; to <= 5; ++to) {
+        for (const int from : classes) {
+            for (const int to : classes) {
                 setState(0);
                 ASSERT_EQ(protection.setClass(file.get(), from), 0);
                 setState(state);
@@ -367,7 +268,7 @@ TEST(FileProtectionClass, RefusesWhatALockTakesAway) {
     }
     setState(0);
     EXPECT_EQ(protection.setClass(file.get(), -1), EINVAL);
-    for (const char* text : {"", "x", "1x", "-1", "99999999999", "00000000000000000001"}) {
+    for (const char* text : {"", "x", "1x", "-1", "4294967298", "00000000000000000001"}) {
         ASSERT_EQ(::fsetxattr(file.get(), protection.attributeName(), text, std::strlen(text), 0), 0);
         EXPECT_EQ(protection.classOf(file.get()), 3) << text;
     }
@@ -379,42 +280,69 @@ TEST(FileProtectionClass, RefusesWhatALockTakesAway) {
     EXPECT_EQ(protection.classOf(file.get()), 4);
 }
 
-// One daemon on one root, and the lock goes with the process however it ends.
-TEST(DaemonLock, HoldsOffASecondDaemon) {
+// Goal: an unlock that is told while its file cannot be opened is not missed. Method: the file changes without a
+// descriptor left, and never again.
+TEST(WantOfDescriptors, AnUnlockIsSeenAfterwards) {
     const TestRoot test;
+    const std::string directory = std::string(names::runtimeDirectory) + "/";
+    EpollRunLoop loop;
+    FileDeviceLockState state(test.root());
+    std::atomic<int> seen{DeviceLockState::locked};
+    test.write(directory + "next", "0");
+    test.write(directory + names::lockState, "1");
+    ASSERT_EQ(state.registerForChanges(loop, [&] { seen = state.currentState(); }), 0);
+    std::thread runner([&] { loop.run(); });
+    {
+        const support::FewDescriptors none(0);
+        EXPECT_EQ(::rename(test.path(directory + "next").c_str(), test.path(directory + names::lockState).c_str()), 0);
+        EXPECT_TRUE(eventually([&] { return seen == FileDeviceLockState::unknown; }));
+    }
+    EXPECT_TRUE(eventually([&] { return seen == DeviceLockState::unlocked; }));
+    loop.stop();
+    runner.join();
+}
+
+// Goal: locks and unlocks are seen while the system gives no change notices, and notices are used as soon as it does.
+// Method: a user namespace that allows none, in a process of its own.
+TEST(WantOfNotices, AnUnlockIsSeenAllTheSame) {
+    enum { good, notTold, notSeen, stillPolls, cannot };
+    const TestRoot test;
+    const std::string file = std::string(names::runtimeDirectory) + "/" + names::lockState;
     const pid_t child = ::fork();
     if (child == 0) {
-        const auto held = DaemonLock::take(test.root());
-        ::kill(::getpid(), held ? SIGSTOP : SIGTERM);
-        ::_exit(0);
+        const auto allowNotices = [](const char* count) {
+            const FileDescriptor limit(::open("/proc/sys/user/max_inotify_instances", O_WRONLY | O_CLOEXEC));
+            return ::write(limit.get(), count, std::strlen(count)) > 0;
+        };
+        if (::unshare(CLONE_NEWUSER) != 0 || !allowNotices("0"))
+            ::_exit(cannot);
+        EpollRunLoop loop;
+        FileDeviceLockState state(test.root());
+        std::atomic<int> seen{FileDeviceLockState::unknown};
+        std::atomic<int> looks{0};
+        if (state.registerForChanges(loop, [&] {
+                seen = state.currentState();
+                ++looks;
+            }) != EMFILE)
+            ::_exit(notTold);
+        std::thread runner([&] { loop.run(); });
+        const auto sees = [&](int next) {
+            test.replace(file, std::to_string(next));
+            return eventually([&] { return seen == next; });
+        };
+        bool seenAll = sees(1) && sees(0) && allowNotices("8");
+        ::usleep(400'000);
+        const int before = looks;
+        ::usleep(600'000);
+        const bool polls = looks != before;
+        seenAll = seenAll && sees(1);
+        ::_exit(!seenAll ? notSeen : polls ? stillPolls : good);
     }
     int status = 0;
-    ASSERT_EQ(::waitpid(child, &status, WUNTRACED), child);
-    EXPECT_TRUE(WIFSTOPPED(status));
-    EXPECT_TRUE(DaemonLock::isHeld(test.root()));
-    const auto second = DaemonLock::take(test.root());
-    ASSERT_FALSE(second);
-    EXPECT_EQ(second.error(), EWOULDBLOCK);
-    ::kill(child, SIGKILL);
-    ::waitpid(child, nullptr, 0);
-    EXPECT_FALSE(DaemonLock::isHeld(test.root()));
-    if (::geteuid() == 0) {
-        // Another user's lock on an inode of that number is none of a daemon's. Here it is the file itself.
-        const pid_t other = ::fork();
-        if (other == 0) {
-            const int file = ::open(test.path("run/zorvane/zorvaned.lock").c_str(), O_RDWR);
-            const bool held = ::flock(file, LOCK_EX) == 0 && ::setuid(501) == 0;
-            ::kill(::getpid(), held ? SIGSTOP : SIGTERM);
-            ::_exit(0);
-        }
-        ASSERT_EQ(::waitpid(other, &status, WUNTRACED), other);
-        EXPECT_TRUE(WIFSTOPPED(status));
-        EXPECT_FALSE(DaemonLock::isHeld(test.root()));
-        ::kill(other, SIGKILL);
-        ::waitpid(other, nullptr, 0);
-    }
-    EXPECT_TRUE(DaemonLock::take(test.root()));
-    EXPECT_EQ(test.read("run/zorvane/zorvaned.lock"), std::to_string(::getpid()) + "\n");
+    ::waitpid(child, &status, 0);
+    if (WEXITSTATUS(status) == cannot)
+        GTEST_SKIP() << "needs a user namespace";
+    EXPECT_EQ(WEXITSTATUS(status), good);
 }
 
 } // namespace

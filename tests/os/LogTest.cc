@@ -1,15 +1,19 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "daemon/RefusalLimiter.h"
 #include "os/RotatingLog.h"
-#include "platform/TestRoot.h"
 #include "plist/Text.h"
+#include "support/TestRoot.h"
+#include "support/Waiting.h"
 
 #include <csignal>
-#include <map>
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sstream>
 #include <sys/resource.h>
 
 namespace zor::platform {
 namespace {
+
+using support::TestRoot;
 
 std::vector<std::string> linesOf(const std::string& text) {
     EXPECT_TRUE(text.empty() || text.ends_with('\n')) << "the last line has no end";
@@ -170,61 +174,6 @@ TEST(RotatingLog, WritesToStandardErrorWithoutWaitingForever) {
         log.write("nobody reads this line of the log any more", 5);
     EXPECT_LT(std::chrono::steady_clock::now() - begun, std::chrono::seconds(5));
     EXPECT_EQ(log.lines().size(), 3001U);
-}
-
-constexpr std::size_t shortLine = 100;
-
-// Each user has so many lines a second and bytes a minute, strangers together; what is left out is told exactly once,
-// when that time is over though nobody is refused any more; and the table of users is bounded.
-TEST(RefusalLimiter, CountsWhatItLeavesOut) {
-    using std::chrono::milliseconds;
-    RefusalLimiter::Clock::time_point now{};
-    std::map<uid_t, std::uint64_t> reported;
-    milliseconds later{0};
-    RefusalLimiter limiter([&](uid_t uid, std::uint64_t count) { reported[uid] += count; },
-                           [&](milliseconds delay) { later = delay; }, [&] { return now; });
-    const auto admitted = [&](uid_t uid, int attempts, std::size_t bytes = shortLine) {
-        int count = 0;
-        for (int i = 0; i < attempts; ++i)
-            count += limiter.admit(uid, bytes) ? 1 : 0;
-        return count;
-    };
-    const auto wait = [&](milliseconds time) {
-        now += time;
-        limiter.reportEnded();
-    };
-    EXPECT_EQ(admitted(501, 1000), 200);
-    EXPECT_EQ(admitted(502, 150), 150);
-    EXPECT_TRUE(reported.empty());
-    EXPECT_EQ(later, milliseconds(1000));
-    wait(later);
-    EXPECT_EQ(reported, (std::map<uid_t, std::uint64_t>{{501, 800}}));
-    // The minute's bytes: 204 lines of a hundred, five of four thousand.
-    EXPECT_EQ(admitted(501, 300), 4);
-    EXPECT_EQ(later, milliseconds(59'000));
-    EXPECT_EQ(admitted(503, 24, 4096), 5);
-    limiter.reportAll(); // somebody looks before the minute is over
-    limiter.reportAll();
-    EXPECT_EQ(reported, (std::map<uid_t, std::uint64_t>{{501, 1096}, {503, 19}}));
-    EXPECT_EQ(admitted(501, 1), 0) << "looking gives no new lines";
-    EXPECT_EQ(admitted(503, 1, 4096), 0);
-    wait(milliseconds(59'000));
-    EXPECT_EQ(reported[501], 1097U);
-    EXPECT_EQ(reported[503], 19U);
-    EXPECT_EQ(later, milliseconds(1000));
-    wait(later);
-    EXPECT_EQ(reported[503], 20U);
-    EXPECT_EQ(admitted(501, 1), 1);
-    // A range of uids is one.
-    EXPECT_EQ(admitted(100'000, 150) + admitted(165'535, 150), 200);
-    // More users than places, within one second: the count of whoever has to go is told.
-    wait(milliseconds(2000));
-    EXPECT_EQ(admitted(1, 201), 200);
-    reported.clear();
-    now += milliseconds(1);
-    for (uid_t uid = 100; uid < 100 + RefusalLimiter::usersMax; ++uid)
-        EXPECT_TRUE(limiter.admit(uid, shortLine));
-    EXPECT_EQ(reported, (std::map<uid_t, std::uint64_t>{{1, 1}}));
 }
 
 } // namespace

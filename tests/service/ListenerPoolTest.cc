@@ -1,13 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "base/BlockingScope.h"
-#include "platform/ListenerWorld.h"
-#include "support/LongRun.h"
+#include "os/SerialWorkQueue.h"
+#include "service/ListenerWorld.h"
 
-#include <condition_variable>
-#include <cstdlib>
-#include <ctime>
-#include <filesystem>
 #include <random>
+#include <semaphore>
 
 namespace zor::platform {
 namespace {
@@ -18,40 +15,26 @@ enum class Announced { yes, no };
 class Gate {
 public:
     void wait(Announced announced) {
-        std::optional<BlockingScope> scope;
-        if (announced == Announced::yes)
-            scope.emplace();
-        std::unique_lock lock(mutex_);
+        std::optional<BlockingScope> outer;
+        std::optional<BlockingScope> inner;
+        if (announced == Announced::yes) {
+            outer.emplace();
+            inner.emplace();
+        }
         ++inside_;
-        changed_.wait(lock, [this] { return open_ || passes_ > 0; });
-        if (!open_)
-            --passes_;
+        passes_.acquire();
         --inside_;
     }
     /// Waits until so many are held.
     bool holds(int count) {
-        return eventually([&] {
-            const std::lock_guard lock(mutex_);
-            return inside_ == count;
-        });
+        return eventually([&] { return inside_ == count; });
     }
-    void letOneThrough() {
-        const std::lock_guard lock(mutex_);
-        ++passes_;
-        changed_.notify_one();
-    }
-    void open() {
-        const std::lock_guard lock(mutex_);
-        open_ = true;
-        changed_.notify_all();
-    }
+    void letOneThrough() { passes_.release(); }
+    void open() { passes_.release(10'000); }
 
 private:
-    std::mutex mutex_;
-    std::condition_variable changed_;
-    bool open_ = false;
-    int passes_ = 0;
-    int inside_ = 0;
+    std::counting_semaphore<> passes_{0};
+    std::atomic<int> inside_{0};
 };
 
 const plist::Dictionary blockRequest = {{"Block", true}};
@@ -137,7 +120,7 @@ TEST(ListenerPool, GrowsAtOnceWhenWorkersSaySo) {
             ++floodServed;
             return;
         }
-        const std::uint64_t number = *event.request.unsignedInteger("Number");
+        const std::uint64_t number = event.request.unsignedInteger("Number").value_or(0);
         if (number == 1 || number == 3)
             working.wait(Announced::no);
         if (number == 1 || number == 2)
@@ -179,83 +162,18 @@ TEST(ListenerPool, GrowsAtOnceWhenWorkersSaySo) {
         EXPECT_TRUE(client.receive());
 }
 
-// Scopes inside scopes, some waiting, some not, under load, lose no request and end in the same small pool.
-TEST(ListenerPool, CountsStayRightUnderMixedLoad) {
-    ListenerWorld world;
-    world.limits.threadsRunning = 2;
-    world.limits.threadIdle = std::chrono::milliseconds(100);
-    world.start([](PeerConnection&, ServiceEvent& event) {
-        const std::uint64_t number = *event.request.unsignedInteger("Number");
-        if (number % 3 == 0) {
-            const BlockingScope outer;
-            const BlockingScope inner;
-            std::this_thread::sleep_for(std::chrono::microseconds(number % 7 * 50));
-        } else if (number % 101 == 1) {
-            std::this_thread::sleep_for(std::chrono::milliseconds(25));
-        }
-        event.reply->send(event.request);
-    });
-    inThreads(8, [&](unsigned) {
-        RawClient client = world.connect();
-        for (std::uint64_t number = 0; number < 400; ++number) {
-            ASSERT_TRUE(client.send(numbered(number), number));
-            ASSERT_TRUE(client.receives(number, numbered(number)));
-        }
-    });
-    EXPECT_TRUE(world.isAtRest());
-    EXPECT_TRUE(eventually([&] { return world.counters().threads == 2; }));
-    EXPECT_EQ(world.counters().threadsBlocked, 0U);
-    EXPECT_EQ(world.counters().messages, 8U * 400);
-}
-
-/// Answers requests from a thread of its own.
-class LateReplier {
-public:
-    explicit LateReplier(std::size_t bytes) : answer_{{"Large", plist::Data(bytes, 2)}}, thread_([this] { run(); }) {}
-    ~LateReplier() {
-        {
-            const std::lock_guard lock(mutex_);
-            done_ = true;
-        }
-        changed_.notify_one();
-    }
-    void take(const ServiceEvent& event) {
-        const std::lock_guard lock(mutex_);
-        late_.push_back(event.reply);
-        changed_.notify_one();
-    }
-
-private:
-    void run() {
-        std::unique_lock lock(mutex_);
-        while (!done_) {
-            changed_.wait(lock, [this] { return done_ || !late_.empty(); });
-            const auto taken = std::exchange(late_, {});
-            lock.unlock();
-            for (const auto& reply : taken)
-                reply->send(answer_);
-            lock.lock();
-        }
-    }
-
-    const plist::Dictionary answer_;
-    std::mutex mutex_;
-    std::condition_variable changed_;
-    std::vector<std::shared_ptr<ReplyChannel>> late_;
-    bool done_ = false;
-    std::jthread thread_;
-};
-
 // Clients that leave at any moment, while replies come at once, late, large or never, leave no charge, no event and no
 // reply to a later connection of the same object.
 TEST(ListenerPool, ConnectionsEndWhileRepliesAreUnderWay) {
     ListenerWorld world;
     world.limits.outputBytesPaused = 50'000;
-    LateReplier replier(70'000);
+    const plist::Dictionary lateAnswer = {{"Large", plist::Data(70'000, 2)}};
+    SerialWorkQueue late("com.veltra.test");
+    ASSERT_TRUE(late.start());
     world.start([&](PeerConnection& connection, ServiceEvent& event) {
-        const std::uint64_t number = *event.request.unsignedInteger("Number");
+        const std::uint64_t number = event.request.unsignedInteger("Number").value_or(0);
         if (number % 6 == 0)
-            replier.take(event);
+            late.async([&lateAnswer, reply = event.reply] { reply->send(lateAnswer); });
         else if (number % 6 == 1)
             event.reply->send({{"Large", plist::Data(100'000, 1)}});
         else if (number % 6 > 2)
@@ -286,6 +204,39 @@ TEST(ListenerPool, ConnectionsEndWhileRepliesAreUnderWay) {
     EXPECT_TRUE(world.isAtRest());
     EXPECT_EQ(world.counts.invalids, static_cast<int>(world.counters().connectionsAccepted));
     EXPECT_EQ(world.counts.others, 0);
+}
+
+// Goal: threads that become free are used although the others never say that they wait. Method: all threads are taken,
+// by handlers that say so and by some that do not; the former end long after the watcher has seen that no thread can be
+// added, and then a request comes.
+TEST(ListenerPool, ThreadsThatAreFreeAgainStandInForStuckOnes) {
+    std::counting_semaphore<> announced(0);
+    std::counting_semaphore<> silent(0);
+    ListenerWorld world;
+    world.limits.threadsRunning = 2;
+    world.limits.threadsMax = 4;
+    world.start([&](PeerConnection&, ServiceEvent& event) {
+        if (event.request == numbered(1)) {
+            const BlockingScope scope;
+            announced.acquire();
+        } else if (event.request == numbered(2)) {
+            silent.acquire();
+        }
+        event.reply->send(event.request);
+    });
+    RawClient other(world.socketPath());
+    std::vector<RawClient> clients;
+    for (const std::uint64_t number : {1U, 1U, 2U, 2U}) {
+        clients.emplace_back(world.socketPath());
+        EXPECT_TRUE(clients.back().send(numbered(number), number));
+    }
+    EXPECT_TRUE(eventually([&] { return world.counts.messages == 4; }));
+    std::this_thread::sleep_for(5 * world.limits.tick);
+    announced.release(2);
+    EXPECT_TRUE(clients[0].receive() && clients[1].receive());
+    std::this_thread::sleep_for(5 * world.limits.tick);
+    EXPECT_TRUE(other.isServed());
+    silent.release(2);
 }
 
 } // namespace

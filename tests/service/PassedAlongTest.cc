@@ -3,7 +3,7 @@
 // in which it lies unread. Method: TCP sockets that linger for twenty seconds, because nobody reads at their far end.
 // They are sent before the listening socket comes to the listener; after that newer kernels refuse them.
 #include "os/EpollRunLoop.h"
-#include "platform/ListenerWorld.h"
+#include "service/ListenerWorld.h"
 #include "service/StatusSocket.h"
 #include "support/FileTree.h"
 #include "support/ProcessResources.h"
@@ -22,15 +22,6 @@ namespace {
 
 using std::chrono::milliseconds;
 using std::chrono::seconds;
-
-/// Whether a test ended before what lingers did.
-class Patience {
-public:
-    ~Patience() { EXPECT_LT(std::chrono::steady_clock::now() - begin_, seconds(10)); }
-
-private:
-    const std::chrono::steady_clock::time_point begin_ = std::chrono::steady_clock::now();
-};
 
 struct LingeringSocket {
     LingeringSocket() {
@@ -77,15 +68,18 @@ private:
     std::vector<FileDescriptor> farEnds_;
 };
 
+/// Answers each request with itself.
 class ListenerOf {
 public:
     ListenerOf(EarlyClients& early, const ListenerLimits& limits) : listener_(identity_, optionsOf(early, limits)) {
         identity_.everybodyOwnsRoot = false;
-        EXPECT_TRUE(listener_.resume([](PeerConnection&, ServiceEvent& event) {
+        EXPECT_TRUE(listener_.resume([this](PeerConnection&, ServiceEvent& event) {
+            messages += event.kind == ServiceEvent::Kind::message ? 1 : 0;
             if (event.reply)
                 event.reply->send(event.request);
         }));
     }
+    std::atomic<int> messages{0};
 
 private:
     static ListenerOptions optionsOf(EarlyClients& early, const ListenerLimits& limits) {
@@ -98,65 +92,76 @@ private:
     LinuxServiceListener listener_;
 };
 
-// Every thread receives one, and there can be no more threads; afterwards nothing of it is open in this process.
-TEST(PassedAlong, DoesNotHoldWhoReceivesIt) {
-    EarlyClients early(4);
-    const support::ProcessResources before;
-    {
-        const Patience patience;
-        const ListenerOf listener(early, {.threadsRunning = 2, .threadsMax = 2});
-        for (RawClient& client : early.clients)
-            EXPECT_TRUE(client.receive());
+// Goal: no thread waits for what lingers, and nothing of it stays open. Method: each way in which a thread can come to
+// close it.
+TEST(PassedAlong, HoldsNobody) {
+    using Act = std::function<void(EarlyClients&)>;
+    const std::pair<const char*, Act> rows[] = {
+        {"who receives it",
+         [](EarlyClients& early) {
+             // There can be no more threads.
+             const ListenerOf listener(early, {.threadsRunning = 2, .threadsMax = 2});
+             for (RawClient& client : early.clients)
+                 EXPECT_TRUE(client.receive());
+         }},
+        {"the stop, while the watcher's ticks are too rare to free a thread",
+         [](EarlyClients& early) {
+             const ListenerOf listener(early, {.threadsRunning = 2, .threadsMax = 2, .tick = milliseconds(1000)});
+             std::this_thread::sleep_for(milliseconds(100));
+         }},
+        {"the acceptor, which refuses all over the user's share",
+         [](EarlyClients& early) {
+             const ListenerOf listener(early, {.connectionsMaxPerUser = 1});
+             EXPECT_TRUE(early.clients[0].receive());
+             for (std::size_t i = 1; i < early.clients.size(); ++i)
+                 EXPECT_TRUE(early.clients[i].ended());
+             early.clients[0].close();
+             EXPECT_TRUE(eventually([&] { return RawClient(early.path()).isServed(); }));
+         }},
+        {"the status's thread, which reads nothing",
+         [](EarlyClients& early) {
+             KernelIdentity identity;
+             EpollRunLoop loop;
+             StatusSocket status(identity, loop, [](Peer&, StatusSocket::Detail) { return plist::Dictionary{}; });
+             ASSERT_EQ(status.adopt(std::move(early.listening)), 0);
+             std::thread thread([&] { loop.run(); });
+             for (RawClient& client : early.clients)
+                 EXPECT_TRUE(client.receive());
+             loop.stop();
+             thread.join();
+         }},
+    };
+    for (const auto& [who, act] : rows) {
+        SCOPED_TRACE(who);
+        EarlyClients early(4);
+        const support::ProcessResources before;
+        const auto begin = std::chrono::steady_clock::now();
+        act(early);
+        EXPECT_LT(std::chrono::steady_clock::now() - begin, seconds(10)) << "it waited for what lingers";
+        EXPECT_EQ(before.leakedSince(), "");
     }
-    EXPECT_EQ(before.leakedSince(), "");
 }
 
-// The watcher's ticks are so rare here that all threads are held when the listener stops.
-TEST(PassedAlong, DoesNotHoldTheStop) {
-    EarlyClients early(2);
-    const Patience patience;
-    const ListenerOf listener(early, {.threadsRunning = 2, .threadsMax = 2, .tick = milliseconds(1000)});
-    std::this_thread::sleep_for(milliseconds(100));
-}
-
-// Connections over the user's share are closed with the bytes unread; the acceptor goes on.
-TEST(PassedAlong, DoesNotHoldWhoRefusesIt) {
-    EarlyClients early(4);
-    const Patience patience;
-    const ListenerOf listener(early, {.connectionsMaxPerUser = 1});
-    EXPECT_TRUE(early.clients[0].receive());
-    for (std::size_t i = 1; i < early.clients.size(); ++i)
-        EXPECT_TRUE(early.clients[i].ended());
-    early.clients[0].close();
-    EXPECT_TRUE(eventually([&] { return RawClient(early.path()).isServed(); }));
-}
-
-// The status reads nothing: its thread, the main one, closes each connection with the bytes in it.
-TEST(PassedAlong, DoesNotHoldTheStatus) {
-    EarlyClients early(3);
-    const Patience patience;
-    KernelIdentity identity;
-    EpollRunLoop loop;
-    StatusSocket status(identity, loop, [](Peer&, StatusSocket::Detail) { return plist::Dictionary{}; });
-    ASSERT_EQ(status.adopt(std::move(early.listening)), 0);
-    std::thread thread([&] { loop.run(); });
-    for (RawClient& client : early.clients)
-        EXPECT_TRUE(client.receive());
-    loop.stop();
-    thread.join();
-}
-
-// Who connected before the listener had the socket is asked for its credentials all the same.
-TEST(PassedAlong, OfAnotherProcessEndsAnEarlyConnectionToo) {
-    EarlyClients early(1);
-    const ListenerOf listener(early, {.threadsRunning = 1, .threadsMax = 1});
-    EXPECT_TRUE(early.clients[0].receive());
+// Goal: nothing that another process sends over a socket it was given is served. Method: a whole request and the second
+// half of one, on a connection made before the listener had its socket, which has no credentials by itself, and after.
+TEST(PassedAlong, ToAnotherProcessIsNotThePeer) {
     const plist::Data frame = frameOf(numbered(2), 2);
-    const pid_t child = ::fork();
-    if (child == 0)
-        ::_exit(::send(early.clients[0].socket(), frame.data(), frame.size(), MSG_NOSIGNAL) > 0 ? 0 : 1);
-    EXPECT_TRUE(early.clients[0].ended());
-    ::waitpid(child, nullptr, 0);
+    for (const bool isEarly : {true, false})
+        for (const std::size_t own : {std::size_t{0}, std::size_t{20}}) {
+            SCOPED_TRACE(own);
+            EarlyClients early(isEarly ? 1 : 0);
+            const ListenerOf listener(early, {.threadsRunning = 1, .threadsMax = 1});
+            RawClient client = isEarly ? std::move(early.clients[0]) : RawClient(early.path());
+            EXPECT_TRUE(isEarly ? client.receive().has_value() : client.isServed());
+            const int before = listener.messages;
+            ASSERT_TRUE(client.send(partOf(frame, 0, own)));
+            const pid_t child = ::fork();
+            if (child == 0)
+                ::_exit(client.send(partOf(frame, own, frame.size())) ? 0 : 1);
+            EXPECT_TRUE(client.ended());
+            EXPECT_EQ(listener.messages, before);
+            ::waitpid(child, nullptr, 0);
+        }
 }
 
 // Once the socket is the listener's the kernel refuses at the sender, if it can.

@@ -1,19 +1,28 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "os/EpollRunLoop.h"
+#include "os/NotifySocket.h"
 #include "os/SerialWorkQueue.h"
-#include "platform/TestRoot.h"
+#include "support/Frames.h"
+#include "support/TestRoot.h"
+#include "support/Waiting.h"
 
 #include <algorithm>
 #include <atomic>
 #include <csignal>
+#include <gtest/gtest.h>
 #include <sched.h>
 #include <sys/eventfd.h>
+#include <sys/socket.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 #include <vector>
 
 namespace zor::platform {
 namespace {
+
+using support::eventually;
+using support::inThreads;
+using support::TestRoot;
 
 // Jobs run one at a time, in order, whichever thread queues them.
 TEST(SerialWorkQueue, RunsOneAtATimeInOrder) {
@@ -109,39 +118,19 @@ TEST(EpollRunLoop, CallsOnlyWhatIsStillWatched) {
     EXPECT_FALSE(loop.watch(-1, [] {}));
 }
 
-// Posting and stopping from other threads loses nothing.
-TEST(EpollRunLoop, TakesJobsFromAnyThread) {
-    EpollRunLoop loop;
-    int ran = 0;
-    std::thread posting([&] {
-        inThreads(4, [&](unsigned) {
-            for (int i = 0; i < 500; ++i)
-                loop.post([&] {
-                    if (++ran == 2000)
-                        loop.stop();
-                });
-        });
-    });
-    loop.run();
-    posting.join();
-    EXPECT_EQ(ran, 2000);
-    loop.stop();
-    loop.run();
-}
-
-TEST(SignalDescriptor, HandsSignalsToTheLoop) {
-    SignalDescriptor signals({SIGUSR2});
-    ASSERT_GE(signals.get(), 0);
-    EXPECT_EQ(signals.take(), std::nullopt);
-    EpollRunLoop loop;
-    std::optional<int> taken;
-    ASSERT_TRUE(loop.watch(signals.get(), [&] {
-        taken = signals.take();
-        loop.stop();
-    }));
-    ASSERT_EQ(::pthread_kill(::pthread_self(), SIGUSR2), 0);
-    loop.run();
-    EXPECT_EQ(taken, SIGUSR2);
+TEST(NotifySocket, SendsOneDatagram) {
+    const TestRoot test;
+    const FileDescriptor socket(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+    const std::string path = test.path("notify");
+    const sockaddr_un address = support::addressOf(path);
+    ASSERT_EQ(::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    EXPECT_EQ(NotifySocket(path).send("READY=1"), 0);
+    char buffer[64];
+    EXPECT_EQ(::recv(socket.get(), buffer, sizeof buffer, MSG_DONTWAIT), 7);
+    EXPECT_EQ(NotifySocket("").send("READY=1"), 0);
+    EXPECT_EQ(NotifySocket(test.path("absent")).send("READY=1"), ENOENT);
+    EXPECT_EQ(NotifySocket("relative").send("READY=1"), EINVAL);
+    EXPECT_EQ(NotifySocket("/" + std::string(200, 'x')).send("READY=1"), EINVAL);
 }
 
 } // namespace

@@ -1,11 +1,16 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "identity/IdentityFile.h"
 #include "identity/CgroupUnit.h"
+#include "identity/LinuxPasswordDatabase.h"
+#include "os/Names.h"
+#include "support/TestRoot.h"
 
 #include <gtest/gtest.h>
 
 namespace zor::platform {
 namespace {
+
+using support::TestRoot;
 
 std::string file(const std::string& body) {
     return "<plist version=\"1.0\"><dict>" + body + "</dict></plist>";
@@ -109,6 +114,24 @@ TEST(CgroupUnit, IsTheSystemManagersUnit) {
     };
     for (const auto& [text, unit] : cases)
         EXPECT_EQ(systemUnitInCgroups(text), unit) << text;
+}
+
+TEST(PasswordDatabase, ReadsTheRootsOwnFile) {
+    const TestRoot test;
+    const LinuxPasswordDatabase database(test.root());
+    EXPECT_FALSE(database.entryForUserId(0)) << "the system's own database must not be asked";
+    test.write(names::passwordFile, "root:x:0:0:root:/private/var/root:/bin/sh\n"
+                                    "# a comment\nbroken line\nmobile:x:501:501::/private/var/mobile:/bin/sh\n"
+                                    "homeless:x:502:502:::/bin/sh\nrelative:x:503:503::home:/bin/sh\n"
+                                    "other:x:501:501::/elsewhere:/bin/sh\n");
+    ASSERT_TRUE(database.entryForUserId(501));
+    EXPECT_EQ(database.entryForUserId(501)->name, "mobile");
+    EXPECT_EQ(database.entryForUserId(501)->homeDirectory, test.path("private/var/mobile"));
+    EXPECT_EQ(database.entryForName("other")->homeDirectory, test.path("elsewhere"));
+    for (const char* name : {"homeless", "relative", "absent", ""})
+        EXPECT_FALSE(database.entryForName(name)) << name;
+    // On the device itself the whole database of the system counts.
+    EXPECT_TRUE(LinuxPasswordDatabase(SystemRoot::open("/").value()).entryForUserId(0));
 }
 
 } // namespace

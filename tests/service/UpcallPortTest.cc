@@ -1,11 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "os/EpollRunLoop.h"
 #include "os/Names.h"
-#include "os/NotifySocket.h"
-#include "platform/ListenerWorld.h"
-#include "service/PassedSockets.h"
+#include "service/ListenerWorld.h"
 #include "service/SeqpacketUpcallPort.h"
 #include "support/ProcessResources.h"
+#include "support/TestRoot.h"
 
 #include <algorithm>
 #include <sys/socket.h>
@@ -14,60 +13,12 @@
 namespace zor::platform {
 namespace {
 
-// Sockets are taken only when they are meant for this process, by name, and none is inherited or left open.
-TEST(PassedSockets, AreTakenByName) {
-    const std::string self = std::to_string(::getpid());
-    constexpr int first = 200;
-    const auto pass = [&](int count) {
-        for (int i = 0; i < count; ++i)
-            ASSERT_EQ(::fcntl(0, F_DUPFD, first + i), first + i);
-    };
-    pass(3);
-    {
-        auto passed = PassedSockets::of({.pid = self, .count = "3", .names = "upcall:other:ipsi"}, first);
-        const FileDescriptor service = passed.take("ipsi");
-        EXPECT_EQ(service.get(), first + 2);
-        EXPECT_EQ(::fcntl(service.get(), F_GETFD), FD_CLOEXEC);
-        EXPECT_EQ(passed.take("upcall").get(), first);
-        EXPECT_FALSE(passed.take("ipsi").valid());
-        EXPECT_FALSE(passed.take("absent").valid());
-    }
-    for (int i = 0; i < 3; ++i)
-        EXPECT_EQ(::fcntl(first + i, F_GETFD), -1);
-    const PassedSockets::Variables meaningless[] = {
-        {.pid = std::to_string(::getppid()), .count = "1", .names = "ipsi"},
-        {.pid = "", .count = "1", .names = "ipsi"},
-        {.pid = self + "x", .count = "1", .names = "ipsi"},
-        {.pid = self, .count = "-1", .names = "ipsi"},
-        {.pid = self, .count = "1000000000", .names = "ipsi"},
-        {.pid = self, .count = "", .names = "ipsi"},
-    };
-    pass(1);
-    for (const auto& variables : meaningless)
-        EXPECT_FALSE(PassedSockets::of(variables, first).take("ipsi").valid()) << variables.pid << variables.count;
-    EXPECT_EQ(::close(first), 0) << "what is another's is left alone";
-    EXPECT_FALSE(PassedSockets::of({.pid = self, .count = "1", .names = "ipsi"}, first).take("ipsi").valid());
-}
-
-TEST(NotifySocket, SendsOneDatagram) {
-    const TestRoot test;
-    const FileDescriptor socket(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
-    const std::string path = test.path("notify");
-    const sockaddr_un address = addressOf(path);
-    ASSERT_EQ(::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
-    EXPECT_EQ(NotifySocket(path).send("READY=1"), 0);
-    char buffer[64];
-    EXPECT_EQ(::recv(socket.get(), buffer, sizeof buffer, MSG_DONTWAIT), 7);
-    EXPECT_EQ(NotifySocket("").send("READY=1"), 0);
-    EXPECT_EQ(NotifySocket(test.path("absent")).send("READY=1"), ENOENT);
-    EXPECT_EQ(NotifySocket("relative").send("READY=1"), EINVAL);
-    EXPECT_EQ(NotifySocket("/" + std::string(200, 'x')).send("READY=1"), EINVAL);
-}
+using support::TestRoot;
 
 /// A port that is served on a thread of its own. Each reply is text: the packet's length, the sender's pid and uid.
 class ServedPort {
 public:
-    explicit ServedPort(const std::string& parent = "/tmp") : test_(parent) {
+    ServedPort() {
         EXPECT_EQ(port_.checkIn(), 0) << port_.checkInCallName();
         EXPECT_TRUE(port_.serve(loop_, [this](const UpcallPacket& packet) { return answer(packet); }));
         thread_ = std::thread([this] { loop_.run(); });
@@ -77,11 +28,9 @@ public:
         thread_.join();
     }
     [[nodiscard]] const TestRoot& test() const { return test_; }
-    [[nodiscard]] std::size_t replyBytesMax() const { return port_.replyBytesMax(); }
     [[nodiscard]] FileDescriptor connect() const {
         FileDescriptor socket(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
-        const std::string directory = "/proc/self/fd/" + std::to_string(test_.root().runtimeDirectory());
-        if (!connectTo(socket.get(), directory + "/" + names::upcallSocket))
+        if (!connectTo(socket.get(), test_.path("run/zorvane/com.veltra.zorvaned.upcall")))
             socket.reset();
         limitWaiting(socket.get());
         return socket;
@@ -181,28 +130,8 @@ TEST(UpcallPort, SurvivesHostilePeers) {
     }));
 }
 
-// The longest reply that the port promises arrives whole; one that is longer is dropped and the port lives on.
-TEST(UpcallPort, SendsWhatItPromises) {
-    ServedPort port;
-    EXPECT_GE(port.replyBytesMax(), std::size_t{64} * 1024);
-    EXPECT_LE(port.replyBytesMax(), std::size_t{1} << 20);
-    const FileDescriptor socket = port.connect();
-    port.replyBytes = port.replyBytesMax();
-    EXPECT_EQ(ask(socket.get(), "x").size(), port.replyBytesMax());
-    port.replyBytes = std::size_t{4} << 20;
-    ASSERT_EQ(::send(socket.get(), "x", 1, 0), 1);
-    ASSERT_TRUE(eventually([&] { return port.answered == 2; }));
-    port.replyBytes = 0;
-    EXPECT_TRUE(ask(socket.get(), "xy").starts_with("2 "));
-}
-
-// A path that no socket address holds works, a stale socket is replaced, and a passed one must be of the right type.
-TEST(UpcallPort, BindsWhereverTheRootLies) {
-    const support::TemporaryDirectory base("/tmp");
-    const std::string parent = base.path() + "/" + std::string(120, 'l');
-    ASSERT_EQ(::mkdir(parent.c_str(), 0755), 0);
-    const ServedPort deep(parent);
-    EXPECT_TRUE(ask(deep.connect().get(), "x").starts_with("1 "));
+// A stale socket is replaced, and a passed one must be of the right type.
+TEST(UpcallPort, TakesOnlyASocketOfItsOwn) {
     const TestRoot test;
     KernelIdentity identity;
     SeqpacketUpcallPort first(test.root(), identity);
@@ -211,7 +140,6 @@ TEST(UpcallPort, BindsWhereverTheRootLies) {
     EXPECT_EQ(second.checkIn(), 0) << "the socket of a daemon that was killed is in nobody's way";
     SeqpacketUpcallPort wrongType(test.root(), identity, FileDescriptor(::socket(AF_UNIX, SOCK_STREAM, 0)));
     EXPECT_EQ(wrongType.checkIn(), EINVAL);
-    EXPECT_STREQ(wrongType.checkInCallName(), "LISTEN_FDS");
 }
 
 } // namespace

@@ -2,7 +2,7 @@
 // Ways in which a process could pass for another: a mount namespace of its own, the number of one that has ended or of
 // another pid namespace, a set-ID program executed on a connection.
 // "agent" is registered, "other" is not.
-#include "platform/PeerProcess.h"
+#include "identity/PeerProcess.h"
 
 #include <fcntl.h>
 #include <sched.h>

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Turns go by user. Users are uids that this test takes while it connects, so it needs root.
 #include "base/BlockingScope.h"
-#include "platform/ListenerWorld.h"
+#include "service/ListenerWorld.h"
 
 #include <semaphore>
 
@@ -47,6 +47,7 @@ TEST_F(TurnsByUser, NotByConnection) {
     const Case cases[] = {
         {"one user with many connections", greedy, 150, 16, modest, 40},
         {"one connection with many requests", greedy, 1, 1000, modest, 40},
+        {"another connection of the user who asks", greedy, 1, 1000, greedy, 40},
         {"a range of uids", 100'000, 150, 16, modest, 40},
         {"an owner of the root", greedy, 150, 16, 0, 40},
     };

@@ -5,11 +5,14 @@
 #include "identity/LinuxPeerIdentity.h"
 #include "os/FileDescriptor.h"
 #include "os/Names.h"
-#include "platform/TestRoot.h"
 #include "support/RecordingLog.h"
+#include "support/TestRoot.h"
+#include "support/Waiting.h"
 
 #include <csignal>
+#include <fcntl.h>
 #include <filesystem>
+#include <gtest/gtest.h>
 #include <linux/sched.h>
 #include <sys/socket.h>
 #include <sys/syscall.h>
@@ -18,6 +21,9 @@
 #include <unistd.h>
 
 namespace zor::platform {
+
+using support::eventually;
+using support::TestRoot;
 
 /// A listening socket with an address that any user can connect to.
 class PeerServer {
@@ -161,7 +167,7 @@ struct PeerWorld {
         return identity.peerOfSocket(process.socket());
     }
 
-    TestRoot test;
+    TestRoot test{"/tmp"}; // programs may be executed there
     support::RecordingLog log{7};
     IdentityRegistry registry{test.root(), log, ::geteuid()};
     LinuxPeerIdentity identity;

@@ -1,7 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "os/EpollRunLoop.h"
-#include "platform/ListenerWorld.h"
+#include "service/ListenerWorld.h"
+#include "service/PassedSockets.h"
 #include "service/StatusSocket.h"
+#include "support/FewDescriptors.h"
 #include "support/ProcessResources.h"
 
 #include <sys/socket.h>
@@ -126,6 +128,61 @@ TEST(ListenerStatus, TooMuchIsToldBriefly) {
     RawClient client(world.directory.socketPath());
     EXPECT_TRUE(client.receives(0, {{"Brief", true}}));
     EXPECT_TRUE(client.ended());
+}
+
+// Goal: a listener that cannot start lets nobody in to wait for ever. Method: a passed socket with a client, and no
+// descriptor for anything else.
+TEST(ListenerSocket, ASocketThatCannotBeServedIsClosed) {
+    const support::TemporaryDirectory directory("/tmp");
+    const FileDescriptor opened(::open(directory.path().c_str(), O_PATH | O_CLOEXEC));
+    auto made = makeListenerSocket({.directory = opened.get(), .directoryPath = directory.path(), .name = "s"},
+                                   SOCK_STREAM, 0666);
+    ASSERT_TRUE(made);
+    RawClient client(directory.path() + "/s");
+    KernelIdentity identity;
+    ListenerOptions options;
+    options.passed = std::move(*made);
+    LinuxServiceListener listener(identity, std::move(options));
+    {
+        const support::FewDescriptors none(0);
+        EXPECT_FALSE(listener.resume([](PeerConnection&, ServiceEvent&) {}));
+    }
+    EXPECT_TRUE(client.ended());
+}
+
+// Sockets are taken only when they are meant for this process, by name, and none is inherited or left open.
+TEST(PassedSockets, AreTakenByName) {
+    const std::string self = std::to_string(::getpid());
+    constexpr int first = 200;
+    const auto pass = [&](int count) {
+        for (int i = 0; i < count; ++i)
+            ASSERT_EQ(::fcntl(0, F_DUPFD, first + i), first + i);
+    };
+    pass(3);
+    {
+        auto passed = PassedSockets::of({.pid = self, .count = "3", .names = "upcall:other:ipsi"}, first);
+        const FileDescriptor service = passed.take("ipsi");
+        EXPECT_EQ(service.get(), first + 2);
+        EXPECT_EQ(::fcntl(service.get(), F_GETFD), FD_CLOEXEC);
+        EXPECT_EQ(passed.take("upcall").get(), first);
+        EXPECT_FALSE(passed.take("ipsi").valid());
+        EXPECT_FALSE(passed.take("absent").valid());
+    }
+    for (int i = 0; i < 3; ++i)
+        EXPECT_EQ(::fcntl(first + i, F_GETFD), -1);
+    const PassedSockets::Variables meaningless[] = {
+        {.pid = std::to_string(::getppid()), .count = "1", .names = "ipsi"},
+        {.pid = "", .count = "1", .names = "ipsi"},
+        {.pid = self + "x", .count = "1", .names = "ipsi"},
+        {.pid = self, .count = "-1", .names = "ipsi"},
+        {.pid = self, .count = "1000000000", .names = "ipsi"},
+        {.pid = self, .count = "", .names = "ipsi"},
+    };
+    pass(1);
+    for (const auto& variables : meaningless)
+        EXPECT_FALSE(PassedSockets::of(variables, first).take("ipsi").valid()) << variables.pid << variables.count;
+    EXPECT_EQ(::close(first), 0) << "what is another's is left alone";
+    EXPECT_FALSE(PassedSockets::of({.pid = self, .count = "1", .names = "ipsi"}, first).take("ipsi").valid());
 }
 
 } // namespace

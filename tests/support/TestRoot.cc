@@ -1,0 +1,108 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "support/TestRoot.h"
+
+#include "support/Files.h"
+
+#include <algorithm>
+#include <cstdio>
+#include <filesystem>
+
+namespace zor::support {
+
+std::string itemAt(const std::string& path) {
+    struct stat status{};
+    if (::lstat(path.c_str(), &status) != 0)
+        return "missing";
+    const char* kind = S_ISDIR(status.st_mode) ? "directory" : S_ISREG(status.st_mode) ? "file" : "other";
+    char text[96];
+    std::snprintf(text, sizeof text, "%s %04o %u:%u", kind, static_cast<unsigned>(status.st_mode & 07777),
+                  status.st_uid, status.st_gid);
+    return text;
+}
+
+std::vector<std::string> namesIn(const std::string& directory) {
+    std::vector<std::string> found;
+    std::error_code none;
+    for (const auto& entry : std::filesystem::directory_iterator(directory, none))
+        found.push_back(entry.path().filename());
+    std::ranges::sort(found);
+    return found;
+}
+
+void furnish(const std::string& root) {
+    writeFile(root + "/etc/passwd", "root:x:0:0::/private/var/root:/bin/sh\n"
+                                    "mobile:x:501:501::/private/var/mobile:/bin/sh\n"
+                                    "second:x:502:502::/private/var/second:/bin/sh\n"
+                                    "homeless:x:503:503::/private/var/nowhere:/bin/sh\n");
+    const struct {
+        const char* name;
+        uid_t owner;
+        mode_t mode;
+    } directories[] = {{"tmp", 0, 01777},
+                       {"private/var/root", 0, 0700},
+                       {"private/var/mobile", 501, 0755},
+                       {"private/var/second", 502, 0755},
+                       {"private/var/brevad", 33, 0755}};
+    for (const auto& [name, owner, mode] : directories) {
+        const std::string path = root + "/" + name;
+        std::filesystem::create_directories(path);
+        checked(::chmod(path.c_str(), mode), path);
+        if (::geteuid() == 0)
+            checked(::chown(path.c_str(), owner, owner), path);
+    }
+}
+
+TestRoot::TestRoot(const std::string& parent) : directory_(parent) {
+    checked(::chmod(directory_.path().c_str(), 0755), directory_.path());
+}
+
+const platform::SystemRoot& TestRoot::root() const {
+    if (!root_) {
+        root_ = platform::SystemRoot::open(directory_.path()).value();
+        errno = root_->makeRuntimeDirectory(disk_);
+        checked(errno == 0 ? 0 : -1, "the runtime directory");
+    }
+    return *root_;
+}
+
+std::string TestRoot::path(std::string_view relative) const {
+    return relative.empty() ? directory_.path() : directory_.path() + "/" + std::string(relative);
+}
+
+void TestRoot::makeDirectories(std::string_view relative, std::optional<uid_t> lastOwner, mode_t mode) const {
+    for (std::size_t end = relative.find('/');; end = relative.find('/', end + 1)) {
+        const std::filesystem::path level = path(relative.substr(0, end));
+        const bool last = end == std::string_view::npos;
+        struct stat above{};
+        checked(::stat(level.parent_path().c_str(), &above), level);
+        // A level on the way is whose the one above it is, and a class of bundles the installer's.
+        const uid_t usual = level.parent_path().native().ends_with("/containers/Bundle") ? 33 : above.st_uid;
+        const uid_t owner = last ? lastOwner.value_or(usual) : usual;
+        if (::mkdir(level.c_str(), 0755) == 0 || (last && (lastOwner || mode != 0755))) {
+            checked(::chmod(level.c_str(), last ? mode : 0755), level);
+            if (::geteuid() == 0)
+                checked(::chown(level.c_str(), owner, owner), level);
+        }
+        if (last)
+            return;
+    }
+}
+
+void TestRoot::write(std::string_view relative, std::string_view bytes, mode_t mode) const {
+    const std::size_t slash = relative.rfind('/');
+    if (slash != std::string_view::npos && !exists(relative.substr(0, slash)))
+        makeDirectories(relative.substr(0, slash));
+    writeFile(path(relative), bytes, mode);
+}
+
+void TestRoot::replace(std::string_view relative, std::string_view bytes, mode_t mode) const {
+    const std::string temporary = std::string(relative) + "~";
+    write(temporary, bytes, mode);
+    checked(::rename(path(temporary).c_str(), path(relative).c_str()), temporary);
+}
+
+std::string TestRoot::read(std::string_view relative) const {
+    return readFile(path(relative));
+}
+
+} // namespace zor::support
