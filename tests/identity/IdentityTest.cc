@@ -246,9 +246,10 @@ TEST(IdentityRegistry, ServesThreadsWhileItChanges) {
             world.registerAs("a.plist", "agent", i < 60 ? std::to_string(i) : "last");
             world.registry.takeNotices();
         }
+        const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(10);
         std::string seen;
-        while ((seen = who(*peer)) != "last" && !seen.empty() && seen != "-") {
-        }
+        while ((seen = who(*peer)) != "last" && !seen.empty() && seen != "-" && std::chrono::steady_clock::now() < end)
+            std::this_thread::yield();
         seeTheLast += seen == "last" ? 1 : 0;
     });
     EXPECT_EQ(seeTheLast, 4);

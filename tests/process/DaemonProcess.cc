@@ -37,7 +37,6 @@ std::vector<std::string> toolWords(const std::string& root, const std::vector<st
 }
 
 DaemonProcess::DaemonProcess(Syncs syncs, const std::string& parent) : directory_(parent), syncs_(syncs) {
-    ::chmod(root().c_str(), 0755);
     support::furnish(root());
     registerProgram("10-tests", ownProgram(), everyPower);
     registerProgram("20-ctl", programPath("zorvanectl"), everyPower);

@@ -30,6 +30,7 @@ std::vector<std::string> namesIn(const std::string& directory) {
 }
 
 void furnish(const std::string& root) {
+    checked(::chmod(root.c_str(), 0755), root);
     writeFile(root + "/etc/passwd", "root:x:0:0::/private/var/root:/bin/sh\n"
                                     "mobile:x:501:501::/private/var/mobile:/bin/sh\n"
                                     "second:x:502:502::/private/var/second:/bin/sh\n"
@@ -52,13 +53,14 @@ void furnish(const std::string& root) {
     }
 }
 
-TestRoot::TestRoot(const std::string& parent) : directory_(parent) {
-    checked(::chmod(directory_.path().c_str(), 0755), directory_.path());
+TestRoot::TestRoot(const std::string& parent, const std::string& existing)
+    : path_(existing.empty() ? directory_.emplace(parent).path() : existing) {
+    checked(::chmod(path_.c_str(), 0755), path_);
 }
 
 const platform::SystemRoot& TestRoot::root() const {
     if (!root_) {
-        root_ = platform::SystemRoot::open(directory_.path()).value();
+        root_ = platform::SystemRoot::open(path_).value();
         errno = root_->makeRuntimeDirectory(disk_);
         checked(errno == 0 ? 0 : -1, "the runtime directory");
     }
@@ -66,7 +68,7 @@ const platform::SystemRoot& TestRoot::root() const {
 }
 
 std::string TestRoot::path(std::string_view relative) const {
-    return relative.empty() ? directory_.path() : directory_.path() + "/" + std::string(relative);
+    return relative.empty() ? path_ : path_ + "/" + std::string(relative);
 }
 
 void TestRoot::makeDirectories(std::string_view relative, std::optional<uid_t> lastOwner, mode_t mode) const {

@@ -24,7 +24,8 @@ void furnish(const std::string& root);
 
 class TestRoot {
 public:
-    explicit TestRoot(const std::string& parent = "/dev/shm");
+    /// A new one below `parent`; `existing`, when given, in its place, which stays.
+    explicit TestRoot(const std::string& parent = "/dev/shm", const std::string& existing = "");
 
     /// Opened when it is first asked for, with its runtime directory; again after `reopen`, to see later mounts.
     [[nodiscard]] const platform::SystemRoot& root() const;
@@ -45,7 +46,8 @@ public:
     [[nodiscard]] std::vector<std::string> names(std::string_view relative) const { return namesIn(path(relative)); }
 
 private:
-    const TemporaryDirectory directory_;
+    std::optional<TemporaryDirectory> directory_;
+    const std::string path_;
     mutable platform::LinuxDisk disk_{platform::Syncs::off};
     mutable std::optional<platform::SystemRoot> root_;
 };

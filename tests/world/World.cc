@@ -19,11 +19,6 @@ namespace zor::test {
 
 namespace {
 
-constexpr const char* passwd = "root:x:0:0::/private/var/root:/bin/sh\n"
-                               "mobile:x:501:501::/private/var/mobile:/bin/sh\n"
-                               "second:x:502:502::/private/var/second:/bin/sh\n"
-                               "homeless:x:503:503::/private/var/nowhere:/bin/sh\n";
-
 bool canGiveAway() {
     return ::geteuid() == 0;
 }
@@ -58,41 +53,11 @@ void require(bool done, const std::string& what) {
 
 } // namespace
 
-std::string itemAt(const std::string& path) {
-    struct stat status{};
-    if (::lstat(path.c_str(), &status) != 0)
-        return "missing";
-    const char* kind = S_ISDIR(status.st_mode) ? "directory" : S_ISREG(status.st_mode) ? "file" : "other";
-    char text[96];
-    std::snprintf(text, sizeof text, "%s %04o %u:%u", kind, static_cast<unsigned>(status.st_mode & 07777),
-                  status.st_uid, status.st_gid);
-    return text;
-}
-
 std::string directoryOf(std::uint32_t owner, mode_t mode) {
     char text[96];
     std::snprintf(text, sizeof text, "directory %04o %u:%u", static_cast<unsigned>(mode),
                   canGiveAway() ? owner : ::geteuid(), canGiveAway() ? owner : ::getegid());
     return text;
-}
-
-void furnish(const std::string& root) {
-    require(::chmod(root.c_str(), 0755) == 0, root);
-    const auto make = [&](const char* directory, std::uint32_t owner = 0, mode_t mode = 0755) {
-        const std::string path = root + "/" + directory;
-        require(::mkdir(path.c_str(), 0755) == 0 && ::chmod(path.c_str(), mode) == 0 &&
-                    (!canGiveAway() || ::chown(path.c_str(), owner, owner) == 0),
-                path);
-    };
-    make("etc");
-    make("tmp", 0, 01777);
-    make("private");
-    make("private/var");
-    make("private/var/root", 0, 0700);
-    make("private/var/mobile", mobile);
-    make("private/var/second", second);
-    make("private/var/brevad", bundleOwnerUserId);
-    std::ofstream(root + "/etc/passwd") << passwd;
 }
 
 bool MountedHome::canBe() {
@@ -111,11 +76,10 @@ MountedHome::~MountedHome() {
 }
 
 World::World(Options options)
-    : log(options.logLevel), options_(std::move(options)),
-      root_(options_.root.empty() ? directory_.emplace(options_.parent).path() : options_.root),
+    : TestRoot(options.parent, options.root), log(options.logLevel), options_(std::move(options)),
       realDisk_(options_.syncs), faults_(options_.disk ? *options_.disk : realDisk_) {
-    if (directory_)
-        furnish(root_);
+    if (options_.root.empty())
+        furnish(path());
     start();
 }
 
@@ -128,7 +92,7 @@ platform::WorkQueue& World::deathRowQueue() {
 }
 
 void World::start() {
-    auto opened = platform::LinuxPlatform::open({.rootDirectory = root_, .syncs = options_.syncs});
+    auto opened = platform::LinuxPlatform::open({.rootDirectory = path(), .syncs = options_.syncs});
     require(opened.has_value(), "no platform");
     platform_ = std::move(*opened);
     const platform::Platform roles = platform_->roles();
@@ -190,59 +154,10 @@ void World::drainDeathRow() {
     reached.get_future().wait();
 }
 
-std::string World::path(std::string_view relative) const {
-    return relative.empty() ? root_ : root_ + "/" + std::string(relative);
-}
-
-void World::makeDirectories(std::string_view relative, std::optional<std::uint32_t> lastOwner, mode_t mode) const {
-    for (std::size_t end = relative.find('/');; end = relative.find('/', end + 1)) {
-        const std::string level = path(relative.substr(0, end));
-        const bool last = end == std::string_view::npos;
-        struct stat above{};
-        require(::stat(parentOf(level).c_str(), &above) == 0, parentOf(level));
-        // A level on the way is whose the one above it is, and a class of bundles the installer's.
-        const std::uint32_t usual = parentOf(level).ends_with("/containers/Bundle") ? bundleOwnerUserId : above.st_uid;
-        const std::uint32_t owner = last ? lastOwner.value_or(usual) : usual;
-        if (::mkdir(level.c_str(), 0755) == 0 || (last && (lastOwner || mode != 0755)))
-            require(::chmod(level.c_str(), last ? mode : 0755) == 0 &&
-                        (!canGiveAway() || ::chown(level.c_str(), owner, owner) == 0),
-                    level);
-        if (last)
-            return;
-    }
-}
-
-void World::write(std::string_view relative, std::string_view bytes, mode_t mode) const {
-    const std::size_t slash = relative.rfind('/');
-    if (slash != std::string_view::npos && !exists(relative.substr(0, slash)))
-        makeDirectories(relative.substr(0, slash));
-    std::ofstream file(path(relative), std::ios::trunc | std::ios::binary);
-    file.write(bytes.data(), static_cast<std::streamsize>(bytes.size()));
-    file.close();
-    require(file.good() && ::chmod(path(relative).c_str(), mode) == 0, std::string(relative));
-}
-
-std::string World::read(std::string_view relative) const {
-    std::ifstream file(path(relative), std::ios::binary);
-    return {std::istreambuf_iterator<char>(file), {}};
-}
-
 plist::Dictionary World::readDictionary(std::string_view relative) const {
     const std::string bytes = read(relative);
     const auto value = plist::readPropertyList({reinterpret_cast<const std::uint8_t*>(bytes.data()), bytes.size()});
     return value && value->asDictionary() ? *value->asDictionary() : plist::Dictionary();
-}
-
-std::vector<std::string> World::names(std::string_view relative) const {
-    std::vector<std::string> found;
-    if (DIR* directory = ::opendir(path(relative).c_str())) {
-        while (const dirent* entry = ::readdir(directory))
-            if (std::string_view(entry->d_name) != "." && std::string_view(entry->d_name) != "..")
-                found.emplace_back(entry->d_name);
-        ::closedir(directory);
-    }
-    std::ranges::sort(found);
-    return found;
 }
 
 std::vector<std::string> World::deathRow() const {

@@ -13,8 +13,9 @@
 #include "os/LinuxDisk.h"
 #include "store/Names.h"
 #include "support/FaultDisk.h"
-#include "support/FileTree.h"
 #include "support/RecordingLog.h"
+#include "support/SettableRoles.h"
+#include "support/TestRoot.h"
 
 #include <atomic>
 #include <functional>
@@ -33,39 +34,9 @@ inline constexpr std::uint32_t second = 502;
 inline constexpr ContainerClass application = ContainerClass::dataApplication;
 inline constexpr bool asTransient = true;
 
-class SettableBuild final : public platform::InternalBuildQuery {
-public:
-    [[nodiscard]] bool isInternalBuild() const override { return internal; }
-    std::atomic<bool> internal{false};
-};
-
-class FlagBootMarker final : public platform::BootMarker {
-public:
-    [[nodiscard]] State look() const override { return state; }
-    int make() override {
-        if (makeError == 0)
-            state = {.present = true, .foreign = false};
-        return makeError;
-    }
-    void forget() override { state = {}; }
-    [[nodiscard]] std::string name() const override { return "marker"; }
-    State state;
-    int makeError = 0;
-};
-
-class SettableLockState final : public platform::DeviceLockState {
-public:
-    [[nodiscard]] int currentState() const override { return state; }
-    int registerForChanges(platform::RunLoop&, std::function<void()> changed) override {
-        notify = std::move(changed);
-        return registrationStatus;
-    }
-    [[nodiscard]] const char* registrationCallName() const override { return "register"; }
-    [[nodiscard]] const char* notificationName() const override { return "lockstate"; }
-    std::atomic<int> state{0};
-    int registrationStatus = 0;
-    std::function<void()> notify;
-};
+using support::FlagBootMarker;
+using support::furnish;
+using support::itemAt;
 
 /// Counts what the queue behind it is told.
 class CountingQueue final : public platform::WorkQueue {
@@ -113,13 +84,8 @@ public:
     int removeError = 0;
 };
 
-/// What lies at a path: kind, permission bits and owner in one text, "missing" when nothing does.
-std::string itemAt(const std::string& path);
-/// The same text for what should lie there. Owners are judged only where the process can give files away.
+/// The text of itemAt for what should lie there. Owners are judged only where the process can give files away.
 std::string directoryOf(std::uint32_t owner, mode_t mode = 0755);
-
-/// The accounts, homes and directories that a device has before its first daemon.
-void furnish(const std::string& root);
 
 /// private/var/mobile as a file system of its own, in a mount namespace of this process.
 class MountedHome {
@@ -138,7 +104,7 @@ private:
     const bool mounted_;
 };
 
-class World {
+class World : public support::TestRoot {
 public:
     struct Options {
         std::string parent = "/dev/shm";
@@ -185,20 +151,10 @@ public:
     }
 
     // The disk below the root; paths are relative to it.
-    [[nodiscard]] std::string path(std::string_view relative = "") const;
     [[nodiscard]] FileURL url(std::string_view relative) const { return FileURL::directory(path(relative)); }
     [[nodiscard]] std::string relative(const std::string& absolute) const { return absolute.substr(path().size() + 1); }
-    /// Missing levels; the last one of the owner and mode given, else the others' owner: that of the directory above.
-    void makeDirectories(std::string_view relative, std::optional<std::uint32_t> lastOwner = {},
-                         mode_t mode = 0755) const;
-    void write(std::string_view relative, std::string_view bytes, mode_t mode = 0644) const;
-    [[nodiscard]] std::string read(std::string_view relative) const;
     /// Empty when there is none.
     [[nodiscard]] plist::Dictionary readDictionary(std::string_view relative) const;
-    [[nodiscard]] std::string item(std::string_view relative) const { return itemAt(path(relative)); }
-    [[nodiscard]] bool exists(std::string_view relative) const { return item(relative) != "missing"; }
-    /// Names in a directory, hidden ones too, sorted.
-    [[nodiscard]] std::vector<std::string> names(std::string_view relative) const;
     /// What is under death row's unique directories, sorted.
     [[nodiscard]] std::vector<std::string> deathRow() const;
 
@@ -210,9 +166,9 @@ public:
     void putContainer(std::string_view relative, const plist::Dictionary& metadata) const;
 
     support::RecordingLog log;
-    SettableBuild internalBuild;
+    support::SettableBuild internalBuild;
     FlagBootMarker bootMarker;
-    SettableLockState lockState;
+    support::SettableLockState lockState;
     CountingQueue lockStateQueue;
     FailingSandbox sandbox;
     support::FaultDisk& disk() { return faults_; }
@@ -228,8 +184,6 @@ private:
     [[nodiscard]] platform::WorkQueue& deathRowQueue();
 
     const Options options_;
-    std::optional<support::TemporaryDirectory> directory_;
-    const std::string root_;
     platform::LinuxDisk realDisk_;
     support::FaultDisk faults_;
     ImmediateQueue immediately_;
