@@ -38,6 +38,11 @@ bool isIdentifierOrNoString(const plist::Value* value) {
 /// error.
 bool identifiersAreUsable(CommandContext& context) {
     const plist::Dictionary& request = context.request;
+    // Hardly any request has something to be looked at by its key.
+    if (std::ranges::none_of(request, [](const plist::Dictionary::Entry& entry) {
+            return entry.second.asArray() || !isIdentifierOrNoString(&entry.second);
+        }))
+        return true;
     for (const std::string_view key : {ipc::keys::identifier, ipc::keys::groupIdentifier, ipc::keys::oldIdentifier,
                                        ipc::keys::newIdentifier, ipc::keys::pageAfter, ipc::keys::identifiersArray}) {
         const plist::Value* value = request.find(key);
@@ -150,15 +155,19 @@ Dispatcher::checkEntitlementsAndInitClientObject(const ZORCommandTableRow& row, 
                                        .onlyOwnIdentifier = identity.grant->onlyOwnIdentifier};
     if (identifier)
         client.bundleIdentifier = *identifier;
-    const auto& together = identity.grant->identifierEntitlements;
-    registerEntitlements(identifier, together ? *together : *entitlements);
+    registerEntitlements(identifier, *identity.grant);
     return std::make_shared<ZORClientConnection>(services_, std::move(client));
 }
 
-void Dispatcher::registerEntitlements(const std::string* identifier, const plist::Dictionary& entitlements) const {
-    static const plist::Dictionary byCaller{{std::string(entitlementMapKeys::registeredByCaller), true}};
-    if (identifier && !services_.entitlements.callerRegistrationIsDue(*identifier, entitlements, byCaller))
+void Dispatcher::registerEntitlements(const std::string* identifier, const platform::IdentityGrant& grant) const {
+    const std::uint64_t generation = services_.entitlements.generation();
+    if (grant.registeredGeneration.get() == generation)
         return;
+    static const plist::Dictionary byCaller{{std::string(entitlementMapKeys::registeredByCaller), true}};
+    const plist::Dictionary& entitlements =
+        grant.identifierEntitlements ? *grant.identifierEntitlements : *grant.entitlements;
+    if (identifier && !services_.entitlements.callerRegistrationIsDue(*identifier, entitlements, byCaller))
+        return grant.registeredGeneration.leave(generation);
     const ErrorCode code = services_.entitlements.processEntitlements(&entitlements, identifier, &byCaller);
     if (code != ErrorCode::success)
         log_.write(logLevelError, handlerName, "Error processing entitlements for %s : %llu", ZOR_SHOWN(identifier),

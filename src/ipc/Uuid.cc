@@ -44,13 +44,13 @@ std::optional<UuidBytes> uuidOf(const plist::Dictionary& dictionary, std::string
 
 std::string uuidText(const UuidBytes& uuid) {
     static constexpr char digits[] = "0123456789ABCDEF";
-    std::string text;
-    text.reserve(textLength);
+    std::string text(textLength, '-');
+    std::size_t index = 0;
     for (const std::uint8_t byte : uuid) {
-        if (hyphenAt(text.size()))
-            text += '-';
-        text += digits[byte >> 4];
-        text += digits[byte & 15];
+        if (hyphenAt(index))
+            ++index;
+        text[index++] = digits[byte >> 4];
+        text[index++] = digits[byte & 15];
     }
     return text;
 }

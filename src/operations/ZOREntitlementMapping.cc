@@ -98,6 +98,7 @@ ZOREntitlementMapping::_onQueue_setEntitlementDictionaryValues(const std::vector
         return makeError(log_, {setFunction, __LINE__}, ErrorCode::entitlementCountsDiffer, nullptr, LogFlag::yes,
                          "Can't act on an invalid input: values count: %ld, IDs count: %ld",
                          static_cast<long>(values.size()), static_cast<long>(identifiers.size()));
+    generation_.fetch_add(1, std::memory_order_acq_rel);
     std::vector<std::pair<std::string, std::optional<plist::Value>>> previous;
     const bool wasUnsaved = unsaved_;
     for (std::size_t i = 0; i < values.size(); ++i) {

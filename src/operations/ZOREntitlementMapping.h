@@ -61,6 +61,9 @@ public:
     /// message.
     [[nodiscard]] bool callerRegistrationIsDue(const std::string& identifier, const plist::Dictionary& entitlements,
                                                const plist::Dictionary& options) ZOR_EXCLUDES(entitlementQueue_);
+    /// Another one after each change of what callerRegistrationIsDue tells; never 0. An answer of it holds while the
+    /// generation is the one that was read before it was asked for. One atomic read.
+    [[nodiscard]] std::uint64_t generation() const { return generation_.load(std::memory_order_acquire); }
     /// Removes what is stored for an identifier and for the children recorded for it. The caller holds the
     /// all-identifiers lock, or knows why it need not.
     void removeEntitlementDictionariesForIdentifierAndItsChildren(const std::string& identifier)
@@ -160,6 +163,8 @@ private:
     std::atomic<bool> fileIsUnread_{false};
     /// This process has done the migration, whether or not it could be marked as done.
     std::atomic<bool> groupIdsAreMigrated_{false};
+    /// Raised on the queue, before the map changes.
+    std::atomic<std::uint64_t> generation_{1};
     platform::Mutex entitlementQueue_;
     plist::Dictionary entitlementMappingDict_ ZOR_GUARDED_BY(entitlementQueue_);
     /// The last save failed: the map is ahead of the file, and no change may be answered with success before one

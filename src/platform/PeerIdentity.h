@@ -4,6 +4,7 @@
 
 #include "plist/Value.h"
 
+#include <atomic>
 #include <cstdint>
 #include <memory>
 #include <optional>
@@ -11,6 +12,21 @@
 #include <sys/types.h>
 
 namespace zor::platform {
+
+/// A number that somebody leaves on an object which others share, to know it again: no part of the object's value, so a
+/// copy begins without one. 0 until it is left. Any thread.
+class LeftNumber {
+public:
+    LeftNumber() = default;
+    LeftNumber(const LeftNumber&) {}
+    LeftNumber& operator=(const LeftNumber&) { return *this; }
+    ~LeftNumber() = default;
+    [[nodiscard]] std::uint64_t get() const { return number_.load(std::memory_order_acquire); }
+    void leave(std::uint64_t number) { number_.store(number, std::memory_order_release); }
+
+private:
+    std::atomic<std::uint64_t> number_{0};
+};
 
 /// The powers that the registry grants to one executable. Immutable and shared: a peer's dictionary is handed out by
 /// pointer, never copied, and two messages of an unchanged peer get the very same object.
@@ -23,6 +39,8 @@ struct IdentityGrant {
     /// The entitlements of all entries of the identifier together; absent where this is its only entry. Stored for the
     /// identifier, and no power.
     std::optional<plist::Dictionary> identifierEntitlements;
+    /// Of the entitlement map: the generation in which nothing of the grant was left to be registered.
+    mutable LeftNumber registeredGeneration{};
 };
 
 /// The answer for one message.

@@ -62,7 +62,12 @@ UserHome::Found UserHome::find() {
     const auto id = opened ? fs::directoryIdOf(opened->get()) : std::unexpected(opened.error());
     if (!id)
         return {.state = isOwnShortage(id.error()) ? State::unknown : State::missing, .directory = {}, .id = {}};
-    return {.state = State::present, .directory = *path, .id = *id};
+    return {.state = State::present, .directory = std::make_shared<const FileURL>(*path), .id = *id};
+}
+
+bool UserHome::Found::isAs(const Found& other) const {
+    return state == other.state && id == other.id && !directory == !other.directory &&
+           (!directory || directory->path() == other.directory->path());
 }
 
 UserHome::Seen UserHome::seenOf(const Found& found) const {
@@ -84,7 +89,7 @@ UserHome::Seen UserHome::look() {
     // A look that fails leaves the state that was known.
     if (now.state == State::unknown)
         return {.state = State::unknown, .directory = {}, .generation = generation()};
-    if (now != found_) {
+    if (!now.isAs(found_)) {
         if (found_.state != State::unknown)
             log_.write(logLevelNotice, "UserHome", "The home of user %u is now %s", userId_,
                        now.directory ? now.directory->c_str() : "(null)");

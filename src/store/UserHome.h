@@ -19,7 +19,7 @@
 #include <atomic>
 #include <cstdint>
 #include <expected>
-#include <optional>
+#include <memory>
 
 namespace zor {
 
@@ -40,8 +40,8 @@ public:
     };
     struct Seen {
         State state = State::unknown;
-        /// While it is present: its path, without links.
-        std::optional<FileURL> directory;
+        /// While it is present: its path, without links; else nullptr.
+        std::shared_ptr<const FileURL> directory;
         /// The generation of this state; never 0.
         std::uint64_t generation = 0;
     };
@@ -60,9 +60,9 @@ public:
 private:
     struct Found {
         State state = State::unknown;
-        std::optional<FileURL> directory;
+        std::shared_ptr<const FileURL> directory;
         fs::DirectoryId id;
-        bool operator==(const Found&) const = default;
+        [[nodiscard]] bool isAs(const Found& other) const;
     };
     [[nodiscard]] Found find();
     Seen seenOf(const Found& found) const;

@@ -69,7 +69,7 @@ void ZORGlobalConfiguration::fenceHomes() {
 
 bool ZORGlobalConfiguration::homeAnswers(std::uint32_t userId) {
     UserHome* const home = homeOf(userId);
-    const auto directory = home ? home->lookIfDue().directory : std::nullopt;
+    const auto directory = home ? home->lookIfDue().directory : nullptr;
     return !directory || fileManager_.resolver().answers(*directory);
 }
 
@@ -154,7 +154,7 @@ std::vector<FileURL> ZORGlobalConfiguration::placesOfContainers() const {
     std::vector<FileURL> places = places_.placesOfSharedContainers();
     for (const auto& home : homes_)
         if (auto seen = home->look(); seen.state == UserHome::State::present && seen.directory)
-            places.push_back(std::move(*seen.directory));
+            places.push_back(*seen.directory);
     return places;
 }
 

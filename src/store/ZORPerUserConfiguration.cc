@@ -24,7 +24,8 @@ std::unique_ptr<ZORPerUserConfiguration> ZORPerUserConfiguration::initWithUserId
 }
 
 std::optional<FileURL> ZORPerUserConfiguration::userHomeDirectory() {
-    return home_.lookIfDue().directory;
+    const auto directory = home_.lookIfDue().directory;
+    return directory ? std::optional(*directory) : std::nullopt;
 }
 
 bool ZORPerUserConfiguration::existsUserBaseDirectory() {
@@ -32,7 +33,7 @@ bool ZORPerUserConfiguration::existsUserBaseDirectory() {
 }
 
 std::optional<UsableDirectory> ZORPerUserConfiguration::openHome() {
-    auto home = home_.look().directory;
+    const auto home = home_.look().directory;
     if (!home)
         return std::nullopt;
     auto opened = fileManager_.resolver().openDirectoryPath(*home);

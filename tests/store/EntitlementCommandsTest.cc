@@ -56,6 +56,20 @@ TEST_F(Shared, GroupPaths) {
     EXPECT_FALSE(isThere(*appPaths.dictionary("ReplyGroupContainerDict")->string("g")));
 }
 
+// Goal: a peer whose registration has not been due since its last message is registered again when somebody removes it.
+// Method: messages of one grant, two before the removal and one after it.
+TEST_F(Shared, ACallerIsRegisteredAgain) {
+    const auto own = grant("self", Dictionary{{appGroups, Array{"g"}}});
+    for (const bool removed : {false, false, true}) {
+        if (removed) {
+            asInstaller();
+            EXPECT_EQ(codeOf({{"Command", 18}, {"Identifier", "self"}}), 1U);
+        }
+        as(own);
+        EXPECT_EQ(groupsIn(request({{"Command", 13}, {"UserID", 1}})), (std::set<std::string>{"g"}));
+    }
+}
+
 // Goal: who is fenced in reaches its own identifier and no other, whatever its powers. Method: a table of requests.
 TEST_F(Shared, OnlyItsOwnIdentifier) {
     (void)codeOf({{"Command", 18}, {"Identifier", "other"}, {"Entitlements", Dictionary{{appGroups, Array{"g"}}}}});

@@ -10,6 +10,9 @@ namespace keys = ipc::keys;
 
 namespace {
 
+/// Of the reply to a lookup.
+constexpr std::size_t replyEntries = 5;
+
 /// A transient container that is asked for again is thrown away, and those of the installer and of the system belong to
 /// no client: what somebody is just installing is in one. False, logged: the context has its error.
 bool mayAskForTransient(CommandContext& context, const std::string* identifier, ContainerClass containerClass) {
@@ -46,19 +49,22 @@ void createOrLookupContainer(CommandContext& context) {
     if (!user || !mayAskFor(context, identifier) ||
         (transient && !mayAskForTransient(context, identifier, containerClass)))
         return;
-    const auto found = context.client->createOrLookupContainerForUser(
+    auto found = context.client->createOrLookupContainerForUser(
         *user, identifier, containerClass,
         {.createIfNecessary = context.request.isTrue(keys::createIfNecessary), .transient = transient});
     if (!found) {
         context.error = found.error().replyCode();
         return;
     }
-    context.reply = plist::Dictionary{
-        {std::string(keys::replyUUID), ipc::uuidValue(found->uuid.bytes())},
-        {std::string(keys::replyExisted), found->existed},
-        {std::string(keys::replyPath), found->path},
-        {std::string(keys::replyIdentifier), found->record->identifier()},
-    };
+    // In the order of the keys and without a copy: most requests end here.
+    std::vector<plist::Dictionary::Entry> reply;
+    reply.reserve(replyEntries);
+    reply.emplace_back(keys::replyError, static_cast<std::uint64_t>(ErrorCode::success));
+    reply.emplace_back(keys::replyExisted, found->existed);
+    reply.emplace_back(keys::replyIdentifier, found->record->identifier());
+    reply.emplace_back(keys::replyPath, std::move(found->path));
+    reply.emplace_back(keys::replyUUID, ipc::uuidValue(found->uuid.bytes()));
+    context.reply = plist::Dictionary::fromUnsorted(std::move(reply));
 }
 
 void listContainers(CommandContext& context) {
