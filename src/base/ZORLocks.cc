@@ -84,6 +84,8 @@ ZORLocks::Record& ZORLocks::admit(std::string_view identifier, LockMode mode) {
     else
         found = identifierToLockMap_.emplace(identifier, std::make_unique<Record>()).first;
     ++(mode == LockMode::writing ? identifierWriterCount_ : identifierReaderCount_);
+    if (mode == LockMode::writing)
+        ++writersBegun_;
     return *found->second;
 }
 
@@ -121,6 +123,7 @@ void ZORLocks::unlock_one_lock(std::string_view identifier) noexcept {
     if (record.lockState == -1) {
         record.lockState = 0;
         --identifierWriterCount_;
+        ++writersEnded_;
         if (identifierReaderCount_ == 0 && identifierWriterCount_ == 0)
             allWriter_.signal();
         if (identifierWriterCount_ == 0 && allReaderWriterState_ != -1)
@@ -152,6 +155,7 @@ void ZORLocks::_lock_all_identifiers(LockMode mode) noexcept {
             else
                 waitForAll(allWriter_);
         allReaderWriterState_ = -1;
+        ++writersBegun_;
     } else {
         while (identifierWriterCount_ != 0 || allReaderWriterState_ == -1)
             waitForAll(allReader_);
@@ -169,6 +173,7 @@ void ZORLocks::unlock_all_identifiers() noexcept {
         }
         if (allReaderWriterState_ == -1) {
             allReaderWriterState_ = 0;
+            ++writersEnded_;
             allWriter_.signal();
             allReader_.broadcast();
             identifierWriter_.broadcast();
@@ -181,6 +186,14 @@ void ZORLocks::unlock_all_identifiers() noexcept {
         }
     }
     ZOR_LOG(log_, logLevelDebug, "Unlocked all identifiers");
+}
+
+std::optional<std::uint64_t> ZORLocks::quietGeneration() const noexcept {
+    // In this order: both only grow and no more end than begin, so when the second look finds no more than had ended
+    // before it, there was nobody at that moment.
+    const std::uint64_t ended = writersEnded_;
+    const std::uint64_t begun = writersBegun_;
+    return begun == ended ? std::optional(begun) : std::nullopt;
 }
 
 std::size_t ZORLocks::identifiersInUse() const {

@@ -14,6 +14,9 @@
 // Taking an identifier's lock may throw for want of memory, and changes nothing then: from the count of a caller on
 // nothing throws, and nothing does that gives a lock back. So a lock that is counted has an owner who gives it back.
 //
+// A mere reader may do without a lock and find out afterwards whether anybody held one for writing meanwhile: each
+// writer is counted before it can hold its lock and once more when it has let go.
+//
 // Misuse (unlocking what is not locked) is said at level 3 and changes nothing.
 #pragma once
 
@@ -24,6 +27,7 @@
 #include <cstdint>
 #include <map>
 #include <memory>
+#include <optional>
 #include <shared_mutex>
 #include <string>
 #include <string_view>
@@ -53,6 +57,11 @@ public:
     void take_one_lock(std::string_view identifier, LockMode mode) ZOR_EXCLUDES(mutex_);
     void unlock_one_lock(std::string_view identifier) noexcept ZOR_EXCLUDES(mutex_);
 
+    /// While nobody holds a lock for writing, or is about to: a number that is another one after each who did. Twice
+    /// the same one, before and after a read, means that nobody wrote in between. nullopt while somebody does. Two
+    /// atomic reads.
+    [[nodiscard]] std::optional<std::uint64_t> quietGeneration() const noexcept;
+
     /// How many identifiers are locked or awaited, for tests and the status.
     [[nodiscard]] std::size_t identifiersInUse() const ZOR_EXCLUDES(mutex_);
 
@@ -79,6 +88,9 @@ private:
     void waitForAll(platform::ConditionVariable& condition) ZOR_REQUIRES(mutex_);
 
     const Log& log_;
+    /// Changed under the mutex.
+    std::atomic<std::uint64_t> writersBegun_{0};
+    std::atomic<std::uint64_t> writersEnded_{0};
     mutable platform::Mutex mutex_;
     platform::ConditionVariable allWriter_;
     platform::ConditionVariable allReader_;

@@ -40,7 +40,7 @@ private:
     std::shared_ptr<ZORClientConnection> checkEntitlementsAndInitClientObject(const ZORCommandTableRow& row,
                                                                               const platform::Identity& identity);
     /// Keeps what is stored for the peer's identifier up to date, unless somebody registered it on the peer's behalf.
-    /// Of a grant that has entitlements the identifier's are meant, whichever of its executables the message comes
+    /// The grant has entitlements; those of the identifier are meant, whichever of its executables the message comes
     /// from. Two atomic reads while neither the grant nor what is stored has changed.
     void registerEntitlements(const std::string* identifier, const platform::IdentityGrant& grant) const;
     void sayMissingEntitlement(const ZORCommandTableRow& row, const platform::Identity& identity) const;

@@ -16,6 +16,7 @@
 #include "ipc/Identifier.h"
 #include "operations/ContainerBuilder.h"
 #include "operations/StoreServices.h"
+#include "operations/UndisturbedLookup.h"
 #include "operations/ZORClientConnection.h"
 #include "operations/ZOREntitlementMapping.h"
 #include "store/ContainerLayout.h"
@@ -40,6 +41,12 @@ Result<FoundContainer> ZORClientConnection::createOrLookupContainerForUser(std::
                                                                            const CreateOrLookupOptions& options) {
     return services_.boundary.run(ZOR_HERE, [&]() -> Result<FoundContainer> {
         TRY(checkRequest(userId, identifier, containerClass));
+        if (options.useLocking == UseLocking::yes && !options.transient)
+            if (auto live = lookUpUndisturbed(services_.locks, services_.cache, userId, containerClass, *identifier)) {
+                live->record->setExisted(true);
+                return FoundContainer{
+                    .record = live->record, .uuid = live->uuid, .path = std::move(live->path), .existed = true};
+            }
         FoundContainer found;
         {
             std::optional<AllIdentifiersLock> lock;

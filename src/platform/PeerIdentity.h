@@ -39,7 +39,7 @@ struct IdentityGrant {
     /// The entitlements of all entries of the identifier together; absent where this is its only entry. Stored for the
     /// identifier, and no power.
     std::optional<plist::Dictionary> identifierEntitlements;
-    /// Of the entitlement map: the generation in which nothing of the grant was left to be registered.
+    /// The generation of the entitlement map in which nothing of the grant was left to be registered.
     mutable LeftNumber registeredGeneration{};
 };
 

@@ -169,12 +169,12 @@ Result<ZORContainerCache::Found> ZORContainerCache::findRecord(const Key& key, c
     return Found{.record = found->record, .place = found->record->place()};
 }
 
-int ZORContainerCache::lookForFile(const Found& found) {
-    if (found.place.empty())
+int ZORContainerCache::lookForFile(const FileURL& container) {
+    if (container.empty())
         return EINVAL;
     // A link or anything else in the file's place is no metadata file: the owner of the container can put it there.
     struct stat status{};
-    const int failure = fileManager_.resolver().status(found.place.url().appendingFile(names::metadataFile), status);
+    const int failure = fileManager_.resolver().status(container.appendingFile(names::metadataFile), status);
     return failure != 0 || S_ISREG(status.st_mode) ? failure : isNoFile;
 }
 
@@ -259,6 +259,36 @@ Result<ZORContainerCache::Record> ZORContainerCache::containerForUser(std::uint3
     });
 }
 
+std::optional<ZORContainerCache::LiveContainer> ZORContainerCache::liveContainerForUser(std::uint32_t userId,
+                                                                                        ContainerClass containerClass,
+                                                                                        const std::string& identifier) {
+    const Key key{userId, containerClass, false};
+    UserHome* const home = homeOf(key);
+    const UserHome::Seen seen = home ? home->lookIfDue() : UserHome::Seen();
+    if (home && seen.state != UserHome::State::present)
+        return std::nullopt;
+    LiveContainer live;
+    ContainerPlace place;
+    {
+        const MutexLock held(cacheLock_);
+        const auto cache = caches_.find(key);
+        if (cache == caches_.end() || (home && cache->second.homeGeneration != seen.generation))
+            return std::nullopt;
+        const auto found = cache->second.entries.find(std::string_view(identifier));
+        if (found == cache->second.entries.end() || !found->record->durable())
+            return std::nullopt;
+        live.record = found->record;
+        live.uuid = found->record->uuid();
+        place = found->record->place();
+    }
+    const FileURL container = place.url();
+    if (lookForFile(container) != 0)
+        return std::nullopt;
+    traceIdentifier({"containerForUser", __LINE__}, key, "Found", identifier);
+    live.path = container.path();
+    return live;
+}
+
 Result<ZORContainerCache::Record> ZORContainerCache::findOnDisk(Here here, const Key& key,
                                                                 const std::string& identifier) {
     Found found = TRY(findRecord(key, identifier));
@@ -266,10 +296,10 @@ Result<ZORContainerCache::Record> ZORContainerCache::findOnDisk(Here here, const
         return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
                          "Cache: %s%s: Invalid URL path string: %s", className(key.containerClass),
                          suffix(key.transient), "(null)");
-    int missing = lookForFile(found);
+    int missing = lookForFile(found.place.url());
     if (missing == ENOENT && lookOver(key, found)) {
         found = TRY(findRecord(key, identifier));
-        missing = lookForFile(found);
+        missing = lookForFile(found.place.url());
     }
     TRY(checkOnDisk(here, key, found, missing, "Found"));
     return found.record;
@@ -330,7 +360,7 @@ ZORContainerCache::thoseOnDisk(Here here, const Key& key, std::vector<Found> fou
     std::vector<Record> records;
     records.reserve(found.size());
     for (Found& one : found) {
-        const auto there = checkOnDisk(here, key, one, lookForFile(one), "ALL Found");
+        const auto there = checkOnDisk(here, key, one, lookForFile(one.place.url()), "ALL Found");
         if (!there && isLeftOpen(there.error(), key))
             return there.error();
         if (there)

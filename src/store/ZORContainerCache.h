@@ -53,6 +53,17 @@ public:
     /// memory, because an encryption hides it, or because the user's home is not there.
     Result<Record> containerForUser(std::uint32_t userId, ContainerClass containerClass, const std::string* identifier,
                                     std::string_view uuidString);
+    /// The parts of a live container that a reply needs: read at one moment, under the mutex of the class caches.
+    struct LiveContainer {
+        Record record;
+        UUID uuid;
+        std::string path;
+    };
+    /// The live container of the identifier when all is as usual: its class has been read in the home that is there,
+    /// its place is on the disk for good, and its metadata file was seen right now. Reads no directory and changes
+    /// nothing.
+    [[nodiscard]] std::optional<LiveContainer> liveContainerForUser(std::uint32_t userId, ContainerClass containerClass,
+                                                                    const std::string& identifier);
     /// Every record whose metadata file is still there. Want of descriptors or memory makes none go missing: error 44;
     /// nor does an encryption, or a home that is not there: error 43.
     Result<std::vector<Record>> allContainersForUser(std::uint32_t userId, ContainerClass containerClass,
@@ -144,7 +155,7 @@ private:
     [[nodiscard]] bool isLeftOpen(const ZORError& error, const Key& key) const;
     ZORError failedToRebuild(Here here, const Key& key, const ZORError& cause);
     /// 0 when the record's metadata file is there, an errno, or -1 when something else is there.
-    int lookForFile(const Found& found);
+    int lookForFile(const FileURL& container);
     /// Reads the class directory again for what has gone from its place; false when that was not to be, yet. True means
     /// that looking the record up again is worth while.
     bool lookOver(const Key& key, const Found& gone) ZOR_EXCLUDES(cacheLock_);

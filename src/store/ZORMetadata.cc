@@ -10,6 +10,7 @@
 #include "plist/Read.h"
 #include "store/Names.h"
 
+#include <bit>
 #include <cerrno>
 #include <cmath>
 #include <fcntl.h>
@@ -75,6 +76,18 @@ FileURL ContainerPlace::url() const {
     return FileURL::directory(std::move(path));
 }
 
+UUID ZORMetadata::uuid() const {
+    const std::array<std::uint64_t, 2> halves{uuid_[0].load(std::memory_order_acquire),
+                                              uuid_[1].load(std::memory_order_acquire)};
+    return UUID(std::bit_cast<UUID::Bytes>(halves));
+}
+
+void ZORMetadata::setUuid(const UUID& uuid) {
+    const auto halves = std::bit_cast<std::array<std::uint64_t, 2>>(uuid.bytes());
+    uuid_[0].store(halves[0], std::memory_order_release);
+    uuid_[1].store(halves[1], std::memory_order_release);
+}
+
 std::optional<int> ZORMetadata::recordedProtectionClass() const {
     const plist::Value* value = info_ ? info_->find(ipc::infoKeys::contentProtectionClass) : nullptr;
     if (!value)
@@ -90,7 +103,7 @@ plist::Dictionary ZORMetadata::fileContent() const {
         {std::string(contentClassKey), static_cast<std::uint64_t>(containerClass_)},
         {std::string(personaKey), uid_},
         {std::string(identifierKey), identifier_},
-        {std::string(uuidKey), uuid_.string()},
+        {std::string(uuidKey), uuid().string()},
     };
     if (info_)
         content.set(infoKey, *info_);

@@ -15,6 +15,7 @@
 #include "fs/ZORFileManager.h"
 #include "plist/Value.h"
 
+#include <array>
 #include <atomic>
 #include <expected>
 #include <memory>
@@ -49,14 +50,18 @@ public:
     /// No checks. `info` may be nullptr.
     ZORMetadata(std::uint32_t uid, UUID uuid, ContainerClass containerClass, std::string identifier, Info info,
                 ContainerPlace place)
-        : identifier_(std::move(identifier)), info_(std::move(info)), place_(std::move(place)), uuid_(uuid), uid_(uid),
-          containerClass_(static_cast<std::uint8_t>(containerClass)) {}
+        : identifier_(std::move(identifier)), info_(std::move(info)), place_(std::move(place)), uid_(uid),
+          containerClass_(static_cast<std::uint8_t>(containerClass)) {
+        setUuid(uuid);
+    }
 
     [[nodiscard]] std::uint32_t uid() const { return uid_; }
     void setUid(std::uint32_t uid) { uid_ = uid; }
     /// The internal UUID, which clients know; not the one in the directory's name.
-    [[nodiscard]] const UUID& uuid() const { return uuid_; }
-    void setUuid(const UUID& uuid) { uuid_ = uuid; }
+    /// A reader without the lock that guards it may get half of either, and sees the writer that gave it the other half
+    /// (ZORLocks::quietGeneration).
+    [[nodiscard]] UUID uuid() const;
+    void setUuid(const UUID& uuid);
     [[nodiscard]] ContainerClass containerClass() const { return static_cast<ContainerClass>(containerClass_); }
     [[nodiscard]] const std::string& identifier() const { return identifier_; }
     [[nodiscard]] const Info& info() const { return info_; }
@@ -87,7 +92,7 @@ private:
     std::string identifier_;
     Info info_;
     ContainerPlace place_;
-    UUID uuid_;
+    std::array<std::atomic<std::uint64_t>, 2> uuid_{};
     std::uint32_t uid_;
     std::uint8_t containerClass_;
     bool transient_ = false;

@@ -189,16 +189,17 @@ TEST_F(Locks, MisuseChangesNothing) {
     EXPECT_EQ(locks.identifiersInUse(), 0U);
 }
 
-// Exclusion holds under load, nothing deadlocks, no signal is lost: pairs of numbers that every holder changes or
-// compares.
+// Exclusion holds under load, nothing deadlocks, no signal is lost, and who reads without a lock finds out about every
+// writer: pairs of numbers that every holder changes or compares.
 TEST_F(Locks, LoadOverEveryMode) {
     const std::string names[] = {"A", "B", "C", "D"};
     struct Pair {
-        long first = 0;
-        long second = 0;
+        std::atomic<long> first{0};
+        std::atomic<long> second{0};
     };
     Pair guarded[4];
     std::atomic<long> broken{0};
+    std::atomic<long> undisturbed{0};
     sink.setLevel(logLevelNotice);
     std::vector<std::jthread> threads;
     for (unsigned seed = 0; seed < 6; ++seed)
@@ -216,7 +217,7 @@ TEST_F(Locks, LoadOverEveryMode) {
                 const LockMode mode = random() % 2 == 0 ? LockMode::reading : LockMode::writing;
                 const std::size_t i = random() % 4;
                 const std::size_t j = random() % 4;
-                const unsigned kind = random() % 3;
+                const unsigned kind = random() % 4;
                 if (kind == 0) {
                     const IdentifierLock one(locks, names[i], mode);
                     use(i, mode);
@@ -225,6 +226,12 @@ TEST_F(Locks, LoadOverEveryMode) {
                     use(i, mode);
                     use(j, mode);
                     locks.unlock_identifier(std::vector{names[i], names[j]});
+                } else if (kind == 2) {
+                    const auto before = locks.quietGeneration();
+                    const bool same = guarded[i].first == guarded[i].second;
+                    const bool quiet = before && locks.quietGeneration() == before;
+                    broken += quiet && !same ? 1 : 0;
+                    undisturbed += quiet ? 1 : 0;
                 } else {
                     const AllIdentifiersLock all(locks, mode);
                     for (std::size_t k = 0; k < 4; ++k)
@@ -234,6 +241,8 @@ TEST_F(Locks, LoadOverEveryMode) {
         });
     threads.clear();
     EXPECT_EQ(broken, 0);
+    EXPECT_GT(undisturbed, 0);
+    EXPECT_TRUE(locks.quietGeneration());
     EXPECT_EQ(locks.identifiersInUse(), 0U);
     EXPECT_TRUE(allIsFree());
     EXPECT_TRUE(sink.take().empty());

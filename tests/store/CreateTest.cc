@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Creating, finding and listing containers: what a container of each class looks like on disk, transient ones, many
 // clients at once, and what users may leave behind.
+#include "operations/UndisturbedLookup.h"
 #include "support/StoreJudge.h"
 #include "world/World.h"
 
@@ -28,6 +29,12 @@ protected:
         for (const auto& container : all.value())
             EXPECT_TRUE(identifiers.insert(container.identifier).second);
         return identifiers;
+    }
+    static ZORClientConnection::ContainerAddress addressOf(const FoundContainer& container) {
+        return {.userId = container.record->uid(),
+                .uuid = container.uuid,
+                .identifier = container.record->identifier(),
+                .containerClass = container.record->containerClass()};
     }
     /// A container's move by its UUID name.
     static bool isMove(const DiskCallInfo& call) {
@@ -155,6 +162,108 @@ TEST_F(Create, ManyClientsAtOnce) {
     }
     EXPECT_EQ(listed().size(), static_cast<std::size_t>(identifiers));
     EXPECT_TRUE(world.names(staging).empty());
+}
+
+// Goal: a lookup, which takes no lock while nobody writes, never answers from the middle of a writer. Method: one
+// thread does every kind of change in turn and notes what is true afterwards; each answer to the others is something
+// noted.
+TEST_F(Create, LookupsBesideEveryWriter) {
+    using Answer = std::pair<std::string, std::string>;
+    constexpr int readers = 3;
+    const std::string id = "com.example";
+    std::set<Answer> noted;
+    std::array<std::set<Answer>, readers> answers;
+    std::atomic<bool> done{false};
+    std::atomic<int> wrong{0};
+    const auto answerOf = [](const FoundContainer& found) { return Answer{found.uuid.string(), found.path}; };
+    auto now = world.make(id);
+    world.log.setLevel(logLevelError);
+    const std::function<bool()> changes[] = {
+        [&] {
+            const plist::Value value(1);
+            return world.daemonsClient().setInfoValue(&value, &id, addressOf(now), UseLocking::yes).has_value();
+        },
+        [&] { return world.daemonsClient().regenerateDirectoryUUIDForUser(addressOf(now)).has_value(); },
+        [&] { return world.daemonsClient().recreateDefaultStructureForUser(addressOf(now)).has_value(); },
+        [&] {
+            const auto fresh = world.make(id, application, asTransient);
+            ZORClientConnection::ReplaceRequest request{.oldUuid = now.uuid, .newUuid = fresh.uuid};
+            request.userIdOld = request.userIdNew = mobile;
+            request.identifierOld = request.identifierNew = id;
+            request.classOld = request.classNew = application;
+            return world.daemonsClient().replaceContainer(request, StartDeletionThread::no).has_value();
+        },
+        [&] { return world.daemonsClient().deleteDataContainerContentForUser(mobile, &id, application).has_value(); },
+        [&] {
+            return world.daemonsClient().deleteContainerForUser(mobile, &id, application, false).has_value() &&
+                   world.create(id).has_value();
+        },
+    };
+    noted.insert(answerOf(now));
+    inParallel(readers + 1, [&](int thread) {
+        if (thread == readers) {
+            for (int round = 0; round < 60; ++round) {
+                wrong += !changes[static_cast<std::size_t>(round) % std::size(changes)]();
+                now = world.find(id).value();
+                noted.insert(answerOf(now));
+            }
+            done = true;
+            return;
+        }
+        while (!done) {
+            const auto found = world.find(id);
+            wrong += !found && !found.error().is(ErrorCode::notFound);
+            if (found)
+                answers[static_cast<std::size_t>(thread)].insert(answerOf(*found));
+        }
+    });
+    EXPECT_EQ(wrong, 0);
+    for (const auto& own : answers)
+        EXPECT_TRUE(std::ranges::includes(noted, own));
+}
+
+// Goal: what is out of the ordinary is left to the lookup under the lock. Method: a table of disturbances.
+TEST_F(Create, LookupsWithoutTheLockGiveWay) {
+    struct Row {
+        const char* what;
+        std::function<void(const FoundContainer&)> disturb;
+        bool givesWay;
+    };
+    const auto metadata = [](const FoundContainer& found) { return found.path + "/" + names::metadataFile; };
+    const Row rows[] = {
+        {"nothing", [](const auto&) {}, false},
+        {"the file's mode has changed", [&](const auto& found) { ::chmod(metadata(found).c_str(), 0600); }, false},
+        {"the file is gone", [&](const auto& found) { ::unlink(metadata(found).c_str()); }, true},
+        {"a link in the file's place",
+         [&](const auto& found) {
+             ::rename(metadata(found).c_str(), (found.path + "/other").c_str());
+             EXPECT_EQ(::symlink("other", metadata(found).c_str()), 0);
+         },
+         true},
+        {"a link on the way",
+         [&](const auto& found) {
+             ::rename(found.path.c_str(), (found.path + ".other").c_str());
+             EXPECT_EQ(::symlink((found.path + ".other").c_str(), found.path.c_str()), 0);
+         },
+         true},
+        {"its place is not on the disk for good", [](const auto& found) { found.record->setDurable(false); }, true},
+        {"the classes have not been read", [&](const auto&) { world.services().store().cache.dropAll(); }, true},
+        {"the home is another one",
+         [&](const auto&) {
+             const std::string home = world.path("private/var/mobile");
+             ::rename(home.c_str(), (home + ".old").c_str());
+             world.makeDirectories("private/var/mobile", mobile);
+             (void)world.services().store().configuration.homeOf(mobile)->look();
+         },
+         true},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.what);
+        const std::string id = "id" + std::to_string(&row - rows);
+        row.disturb(world.make(id));
+        auto& store = world.services().store();
+        EXPECT_EQ(!lookUpUndisturbed(store.locks, store.cache, mobile, application, id), row.givesWay);
+    }
 }
 
 // Goal: users can leave only so much behind in memory, whatever class it is of and over restarts; owners of the root,

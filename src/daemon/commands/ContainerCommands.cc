@@ -10,7 +10,7 @@ namespace keys = ipc::keys;
 
 namespace {
 
-/// Of the reply to a lookup.
+/// How many the reply to a lookup has.
 constexpr std::size_t replyEntries = 5;
 
 /// A transient container that is asked for again is thrown away, and those of the installer and of the system belong to
