@@ -51,7 +51,7 @@ public:
     }
 
 private:
-    void arm() { [[maybe_unused]] const bool armed = core_.pool.rearm(socket_, *this, EPOLLIN); }
+    void arm() { [[maybe_unused]] const bool armed = core_.pool.change(socket_, *this, EPOLLIN | EPOLLONESHOT); }
 
     void admit(PeerSocket socket) {
         // A peer that connected before the listening socket came to the daemon has not taken it over. Whatever such a
@@ -124,7 +124,7 @@ int LinuxServiceListener::begin(ServiceHandler handler) {
     acceptance_ = std::make_unique<Acceptance>(socket_.get(), identity_, *core_);
     if (!core_->pool.start())
         return EAGAIN;
-    return core_->pool.add(socket_.get(), *acceptance_, EPOLLIN) ? 0 : errno;
+    return core_->pool.add(socket_.get(), *acceptance_, EPOLLIN | EPOLLONESHOT) ? 0 : errno;
 }
 
 int LinuxServiceListener::takeSocket() {

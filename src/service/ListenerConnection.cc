@@ -62,7 +62,9 @@ void ListenerConnection::open(PeerSocket socket, std::unique_ptr<Peer> peer, Lis
         over_ = false;
         open_ = true;
         ++life_;
-        added = core_.pool.add(descriptor_, *this, EPOLLIN);
+        lookAgain_ = false;
+        awaited_ = eventsWanted();
+        added = core_.pool.add(descriptor_, *this, awaited_);
         held_ = !added;
     }
     if (!added)
@@ -83,33 +85,50 @@ void ListenerConnection::endAfterStop() {
 void ListenerConnection::run(ListenerScratch& scratch, std::uint32_t events) {
     {
         const MutexLock lock(mutex_);
-        // Out of date, or another worker has it and will arm it again: nothing is lost, arming reports what is there.
-        if (!open_ || (events != 0 && held_))
+        if (!open_)
+            return; // out of date
+        if (events != 0 && held_) {
+            lookAgain_ = true;
             return;
+        }
         held_ = true;
-        if (output_.pendingBytes() > 0 && output_.flush(descriptor_) == ListenerOutput::Result::broken)
-            dropLocked();
     }
-    Outcome outcome = Outcome::end;
-    try {
-        outcome = keepRest(serve(scratch));
-        if (outcome == Outcome::requeue)
-            return core_.pool.requeue(*this);
-    } catch (const std::exception&) {
-        // One request less is better than no daemon. Its peer learns at once that there will be no reply.
-        outcome = endWithIncident(ListenerIncident::unservable, peer_->pid());
-    }
-    if (outcome == Outcome::end || !letGo())
+    Outcome outcome = Outcome::wait;
+    Turn turn;
+    do {
+        try {
+            outcome = keepRest(serve(scratch, turn));
+            if (outcome == Outcome::requeue)
+                return core_.pool.requeue(*this);
+        } catch (const std::exception&) {
+            // One request less is better than no daemon. Its peer learns at once that there will be no reply.
+            outcome = endWithIncident(ListenerIncident::unservable, peer_->pid());
+        }
+    } while (outcome == Outcome::wait && !letGo());
+    if (outcome == Outcome::end)
         close();
 }
 
-ListenerConnection::Outcome ListenerConnection::serve(ListenerScratch& scratch) {
-    Turn turn;
+void ListenerConnection::lookAtRoom() {
+    // Before the looks: what comes after them sets the mark again.
+    lookAgain_ = false;
+    if (output_.pendingBytes() == 0)
+        return;
+    const MutexLock lock(mutex_);
+    if (output_.flush(descriptor_) == ListenerOutput::Result::broken)
+        dropLocked();
+}
+
+ListenerConnection::Outcome ListenerConnection::serve(ListenerScratch& scratch, Turn& turn) {
     for (;;) {
+        lookAtRoom();
         if (const std::optional<Outcome> outcome = serveArrived(scratch, turn))
             return *outcome;
         if (output_.pendingBytes() >= core_.limits.outputBytesPaused)
             return Outcome::wait;
+        // Also from a peer that sends byte by byte.
+        if (turn.receives++ >= core_.limits.framesPerTurn)
+            return Outcome::requeue;
         switch (input_.receive(descriptor_, scratch)) {
         case ListenerInput::Received::bytes:
             break;
@@ -122,10 +141,6 @@ ListenerConnection::Outcome ListenerConnection::serve(ListenerScratch& scratch) 
         case ListenerInput::Received::tooMuch:
             return endWithIncident(ListenerIncident::tooMuchInput, static_cast<std::int64_t>(peer_->kernelUserId()));
         }
-        if (input_.filled())
-            continue;
-        // Probably that was all; if not, arming says so at once, after others have had their turn.
-        return serveArrived(scratch, turn).value_or(Outcome::wait);
     }
 }
 
@@ -203,8 +218,9 @@ std::shared_ptr<ListenerConnection::Channel> ListenerConnection::channelFor(std:
 std::uint32_t ListenerConnection::eventsWanted() const {
     const std::size_t pending = output_.pendingBytes();
     if (pending == 0)
-        return EPOLLIN;
-    return pending < core_.limits.outputBytesPaused ? std::uint32_t{EPOLLIN | EPOLLOUT} : std::uint32_t{EPOLLOUT};
+        return EPOLLIN | EPOLLET;
+    return pending < core_.limits.outputBytesPaused ? std::uint32_t{EPOLLIN | EPOLLOUT | EPOLLET}
+                                                    : std::uint32_t{EPOLLOUT | EPOLLET};
 }
 
 ListenerConnection::Outcome ListenerConnection::keepRest(Outcome outcome) {
@@ -214,34 +230,24 @@ ListenerConnection::Outcome ListenerConnection::keepRest(Outcome outcome) {
 }
 
 bool ListenerConnection::letGo() {
-    int descriptor = -1;
-    std::uint32_t events = 0;
-    {
-        const MutexLock lock(mutex_);
-        if (over_)
-            return false;
-        events = eventsWanted();
-        Arming expected = Arming::no;
-        if (!arming_.compare_exchange_strong(expected, Arming::underway)) {
-            // The worker that had it before is not through yet. Its arming is out of date, and it will see that.
-            held_ = !core_.pool.rearm(descriptor_, *this, events);
-            return !held_;
-        }
-        held_ = false;
-        descriptor = descriptor_;
-    }
-    const bool armed = core_.pool.rearm(descriptor, *this, events);
-    if (arming_.exchange(Arming::no) == Arming::closesAfterwards) {
-        release();
-        return true;
-    }
-    if (armed && eventsWanted() == events)
-        return true;
     const MutexLock lock(mutex_);
-    if (!open_ || held_)
+    if (over_ || lookAgain_ || !await())
+        return false;
+    held_ = false;
+    return true;
+}
+
+bool ListenerConnection::await() {
+    const std::uint32_t wanted = eventsWanted();
+    if (wanted == awaited_)
         return true;
-    held_ = !core_.pool.rearm(descriptor_, *this, eventsWanted());
-    return !held_;
+    // The kernel tells anew what is there already.
+    if (!core_.pool.change(descriptor_, *this, wanted)) {
+        over_ = true;
+        return false;
+    }
+    awaited_ = wanted;
+    return true;
 }
 
 void ListenerConnection::close() {
@@ -255,24 +261,14 @@ void ListenerConnection::close() {
     input_.close();
     channel_.reset();
     peer_.reset();
+    PeerSocket socket;
+    ListenerCharges::Account* account = nullptr;
     {
         const MutexLock lock(mutex_);
         output_.close();
         core_.pool.remove(descriptor_);
         open_ = false;
         held_ = false;
-        Arming expected = Arming::underway;
-        if (arming_.compare_exchange_strong(expected, Arming::closesAfterwards))
-            return;
-    }
-    release();
-}
-
-void ListenerConnection::release() {
-    PeerSocket socket;
-    ListenerCharges::Account* account = nullptr;
-    {
-        const MutexLock lock(mutex_);
         socket = std::move(socket_);
         descriptor_ = -1;
         account = std::exchange(account_, nullptr);
@@ -302,7 +298,7 @@ void ListenerConnection::transmit(Channel& channel, plist::Data& frame) {
     case ListenerOutput::Result::done:
         return;
     case ListenerOutput::Result::kept:
-        if (!held_ && !core_.pool.rearm(socket_.get(), *this, eventsWanted()))
+        if (!held_ && !await())
             dropLocked();
         return;
     case ListenerOutput::Result::tooMuch:

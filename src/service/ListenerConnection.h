@@ -2,9 +2,13 @@
 // One client's connection. Objects are reused and live as long as the listener, so an event that is out of date finds
 // an object, and that the object tells it so.
 //
-// A connection is either armed in epoll, or *held* by one worker (also while it is requeued). Its holder reads,
-// serves and closes; nobody else does. Replies may be sent by any thread at any time: a thread that does not hold the
-// connection arms it again under the mutex, so that the unsent rest is looked after.
+// The kernel tells each arrival once. The worker that takes the event *holds* the connection until the kernel has
+// nothing more for it (also while it is requeued): it reads, serves and closes; nobody else does. An event that another
+// worker takes meanwhile is left to the holder, who looks again before it lets go. That bytes came short of what there
+// was room for tells nothing: those of another sender may wait behind them, and no event comes for those any more.
+//
+// Replies may be sent by any thread at any time. While some are unsent, the connection waits for room as well: the
+// holder sees to that when it lets go, and with no holder the thread that sent.
 #pragma once
 
 #include "base/Mutex.h"
@@ -62,11 +66,14 @@ private:
     /// How much of its turn the connection has had.
     struct Turn {
         unsigned frames = 0;
+        unsigned receives = 0;
         /// Looked at when a second frame is at hand: most turns have one, and need no clock.
         std::chrono::steady_clock::time_point firstServed;
     };
 
-    Outcome serve(ListenerScratch& scratch);
+    /// Sends on of what is kept, as far as there is room, and forgets what has happened before.
+    void lookAtRoom() ZOR_EXCLUDES(mutex_);
+    Outcome serve(ListenerScratch& scratch, Turn& turn);
     [[nodiscard]] bool isOver(Turn& turn) const;
     /// Keeps what has arrived of the next request, whatever the worker's scratch buffer is used for meanwhile.
     Outcome keepRest(Outcome outcome);
@@ -77,11 +84,11 @@ private:
     Outcome endWithOther(ListenerIncident incident);
     Outcome endWithIncident(ListenerIncident incident, std::int64_t about);
     std::shared_ptr<Channel> channelFor(std::uint64_t id) ZOR_EXCLUDES(mutex_);
-    /// Gives the connection back to epoll. False when it has to be closed instead.
+    /// Ends the hold. False when there is more to do.
     bool letGo() ZOR_EXCLUDES(mutex_);
+    /// Has epoll tell what the connection waits for now. False when it cannot be told.
+    [[nodiscard]] bool await() ZOR_REQUIRES(mutex_);
     void close() ZOR_EXCLUDES(mutex_);
-    /// The end of close, and of this life.
-    void release() ZOR_EXCLUDES(mutex_);
 
     /// Sends one frame for a channel, if that still stands for a reply of this life.
     void transmit(Channel& channel, plist::Data& frame) ZOR_EXCLUDES(mutex_);
@@ -102,8 +109,8 @@ private:
     /// No more requests are served and no more replies sent. Once set it stays so for this life.
     std::atomic<bool> over_{false};
 
-    enum class Arming : std::uint8_t { no, underway, closesAfterwards };
-    std::atomic<Arming> arming_{Arming::no};
+    /// An event has come since the holder began to look the last time.
+    std::atomic<bool> lookAgain_{false};
 
     Mutex mutex_;
     /// Closed only by the holder, who therefore may use descriptor_, the same number, without the mutex.
@@ -112,6 +119,7 @@ private:
     uid_t uid_ ZOR_GUARDED_BY(mutex_) = 0;
     bool open_ ZOR_GUARDED_BY(mutex_) = false;
     bool held_ ZOR_GUARDED_BY(mutex_) = false;
+    std::uint32_t awaited_ ZOR_GUARDED_BY(mutex_) = 0;
     /// Which of the connections that this object has been; a channel belongs to one.
     std::uint64_t life_ ZOR_GUARDED_BY(mutex_) = 0;
     /// pendingBytes() may be read without the mutex.

@@ -37,7 +37,6 @@ void ListenerInput::open(ListenerCharges& charges, ListenerCharges::Account& acc
     charges_ = &charges;
     account_ = &account;
     peerPid_ = peerPid;
-    filled_ = false;
 }
 
 void ListenerInput::close() {
@@ -126,7 +125,6 @@ std::optional<ListenerInput::Room> ListenerInput::makeRoom(ListenerScratch& scra
 }
 
 ListenerInput::Received ListenerInput::receive(int socket, ListenerScratch& scratch) {
-    filled_ = false;
     const std::optional<Room> room = makeRoom(scratch);
     if (!room)
         return Received::tooMuch;
@@ -155,7 +153,6 @@ ListenerInput::Received ListenerInput::receive(int socket, ListenerScratch& scra
     const std::size_t toKept = std::min(count, room->kept);
     keptEnd_ += toKept;
     inScratch_ = {scratch.bytes.get(), inScratch_.size() + count - toKept};
-    filled_ = count == room->kept + room->scratch;
     return Received::bytes;
 }
 

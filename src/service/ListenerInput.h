@@ -42,8 +42,6 @@ public:
     };
     /// Receives once. The pending bytes are the beginning of one frame with a valid header, or less.
     [[nodiscard]] Received receive(int socket, ListenerScratch& scratch);
-    /// Whether the last receive took all it had room for, so that there may be more.
-    [[nodiscard]] bool filled() const { return filled_; }
 
     /// The bytes to look at. A frame that has arrived whole lies in them whole. After consuming one, ask again.
     [[nodiscard]] std::span<const std::uint8_t> pending() const;
@@ -65,7 +63,6 @@ private:
     ListenerCharges* charges_ = nullptr;
     ListenerCharges::Account* account_ = nullptr;
     pid_t peerPid_ = 0;
-    bool filled_ = false;
 
     // In order: first what is kept, then what lies in the scratch buffer.
     std::unique_ptr<std::uint8_t[]> kept_;

@@ -120,12 +120,12 @@ void ListenerPool::stop() {
 }
 
 bool ListenerPool::add(int fd, ListenerTask& task, std::uint32_t events) {
-    epoll_event event = {.events = events | EPOLLONESHOT, .data = {.ptr = &task}};
+    epoll_event event = {.events = events, .data = {.ptr = &task}};
     return ::epoll_ctl(epoll_.get(), EPOLL_CTL_ADD, fd, &event) == 0;
 }
 
-bool ListenerPool::rearm(int fd, ListenerTask& task, std::uint32_t events) {
-    epoll_event event = {.events = events | EPOLLONESHOT, .data = {.ptr = &task}};
+bool ListenerPool::change(int fd, ListenerTask& task, std::uint32_t events) {
+    epoll_event event = {.events = events, .data = {.ptr = &task}};
     return ::epoll_ctl(epoll_.get(), EPOLL_CTL_MOD, fd, &event) == 0;
 }
 

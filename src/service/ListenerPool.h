@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// The threads that serve clients: an elastic pool around one epoll whose descriptors are armed for one event at a time.
-// The thread that takes an event does all of its work itself.
+// The threads that serve clients: an elastic pool around one epoll that tells each event once. The thread that takes an
+// event does all of its work itself.
 //
 // Terms: a worker is *waiting* in epoll_wait, *working* on an event, *blocked* inside one (it said so with a
 // BlockingScope, or the watcher found out), or *parked* because enough others run. Waiting and working ones are
@@ -13,11 +13,9 @@
 //   - whenever fewer are active than may run, at least one is waiting, or the pool has threadsMax threads: so work that
 //     arrives is always seen by somebody. Whoever makes "nobody waits" or "fewer are active" true looks at the other
 //     and adds a worker; both counters are sequentially consistent, so one of two that meet sees it;
-//   - an armed descriptor wakes one worker, and whoever leaves tasks waiting for their turn (ListenerTurns.h) wakes one
-//   that
-//     has nothing to do. A task may still be called for an event that is out of date, or while
-//   another
-//     worker has it (after a rearm from outside): it has to tell that itself.
+//   - an event wakes one worker, and whoever leaves tasks waiting for their turn (ListenerTurns.h) wakes one that has
+//     nothing to do. A task may be called for an event that is out of date, or while another worker has it: it has to
+//     tell that itself.
 // The watcher is a thread that ticks while nobody waits, and until no receive is under way, and else sleeps without a
 // timeout; an idle pool costs nothing. Handlers that only compute never make the pool grow: the watcher looks at the
 // state of their threads.
@@ -64,9 +62,10 @@ public:
     /// Lets running tasks end, then joins all threads. Events that nobody took are lost. Not from a task.
     void stop();
 
-    // Descriptors. `events` are those of epoll; EPOLLONESHOT is added. Any thread, while the pool lives.
+    // Descriptors. `events` are those of epoll, with EPOLLET or EPOLLONESHOT among them. After a change the kernel
+    // tells again what is there. Any thread, while the pool lives.
     [[nodiscard]] bool add(int fd, ListenerTask& task, std::uint32_t events);
-    [[nodiscard]] bool rearm(int fd, ListenerTask& task, std::uint32_t events);
+    [[nodiscard]] bool change(int fd, ListenerTask& task, std::uint32_t events);
     void remove(int fd);
 
     /// Has the task called again, in the turn of its line. From a task.

@@ -7,7 +7,7 @@ namespace zor::platform {
 
 void ListenerTurns::add(ListenerTask& task, std::uint32_t events) {
     if (task.waits_) {
-        // One that was requeued is held by its line, and arms its descriptor when it is done: nothing is lost.
+        // One that was requeued is held by its line, and looks until there is nothing more when its turn comes.
         if (!task.isRequeued_)
             task.events_ |= events;
         return;

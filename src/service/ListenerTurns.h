@@ -74,8 +74,8 @@ class ListenerTask {
 public:
     explicit ListenerTask(ListenerLine* line = nullptr) : line_(line) {}
     virtual ~ListenerTask() = default;
-    /// The epoll events that came, or 0 after a requeue. The task arms its descriptor again when it is done. It throws
-    /// nothing: the thread serves others too.
+    /// The epoll events that came, or 0 after a requeue. The kernel tells no event twice: the task looks until there is
+    /// nothing more. It throws nothing: the thread serves others too.
     virtual void run(ListenerScratch& scratch, std::uint32_t events) = 0;
 
     /// Before the task is added to a pool. An event that is out of date may still find it in the line of before.
