@@ -1,6 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "base/ZORError.h"
 
+#include "base/LogSubject.h"
+
 #include <bit>
 #include <cerrno>
 #include <cstring>
@@ -82,6 +84,7 @@ ErrorCode ZORError::replyCode() const {
 void logError(const Log& log, const ZORError& error) {
     if (!error.description())
         return;
+    const LogCodeScope about(error.replyCode());
     if (error.underlying())
         log.write(logLevelError, error.functionName(), "%d: %s (%s)", error.sourceFileLine(),
                   error.description()->c_str(), error.underlying()->text().c_str());

@@ -2,6 +2,7 @@
 #include "daemon/Dispatcher.h"
 
 #include "base/EntitlementKeys.h"
+#include "base/LogSubject.h"
 #include "ipc/Identifier.h"
 #include "operations/ZOREntitlementMapping.h"
 
@@ -60,12 +61,29 @@ bool identifiersAreUsable(CommandContext& context) {
     return true;
 }
 
+/// For those who read what the request made the log say.
+void describeRequest(const platform::Peer& peer, const plist::Dictionary& request, const LogSubject::Take& take) {
+    take("ZORVANE_PEER_PID", std::to_string(peer.pid()));
+    take("ZORVANE_PEER_UID", std::to_string(peer.kernelUserId()));
+    take("ZORVANE_COMMAND", std::to_string(request.unsignedInteger(ipc::keys::command).value_or(0)));
+    if (const std::string* identifier = request.string(ipc::keys::identifier))
+        take("ZORVANE_IDENTIFIER", *identifier);
+    if (const auto containerClass = request.unsignedInteger(ipc::keys::containerClass))
+        take("ZORVANE_CLASS", std::to_string(*containerClass));
+    if (const auto user = request.unsignedInteger(ipc::keys::userId))
+        take("ZORVANE_USER", std::to_string(*user));
+}
+
 } // namespace
 
 void Dispatcher::ZORProcessIpsiEvent(platform::PeerConnection& connection, platform::ServiceEvent& event) {
     if (event.kind == platform::ServiceEvent::Kind::invalid)
         return;
     const Log::ClientScope provoked(connection.peer().kernelUserId());
+    const std::function<void(const LogSubject::Take&)> describe = [&](const LogSubject::Take& take) {
+        describeRequest(connection.peer(), event.request, take);
+    };
+    const LogRequestScope asked(describe);
     if (serve(connection, event)) {
         served_.fetch_add(1, std::memory_order_relaxed);
     } else {

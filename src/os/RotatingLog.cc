@@ -33,8 +33,8 @@ std::int64_t monotonicSeconds() {
 
 } // namespace
 
-RotatingLog::RotatingLog(Foreground foreground, int standardError)
-    : foreground_(foreground), standardError_(standardError) {}
+RotatingLog::RotatingLog(Foreground foreground, int standardError, Journal journal)
+    : foreground_(foreground), standardError_(standardError), journal_(std::move(journal)) {}
 
 bool RotatingLog::open(std::string_view name, int level) {
     if (name.empty())
@@ -59,7 +59,13 @@ void RotatingLog::enableDiskLogging(const std::string& path, unsigned fileCount,
     else
         openFile();
     if (!file_.valid())
-        ::syslog(LOG_DAEMON | LOG_ERR, "Failed to open the log file %s: %s", path.c_str(), ::strerrordesc_np(error_));
+        sayNoFile(path);
+}
+
+void RotatingLog::sayNoFile(const std::string& path) const {
+    const std::string text = formatted("Failed to open the log file %s: %s", path.c_str(), ::strerrordesc_np(error_));
+    if (!writeToJournal(LOG_ERR, "log", text))
+        ::syslog(LOG_DAEMON | LOG_ERR, "%s", text.c_str());
 }
 
 void RotatingLog::write(int level, std::string_view function, std::string_view message) {
@@ -68,11 +74,19 @@ void RotatingLog::write(int level, std::string_view function, std::string_view m
     const bool inFile = open_.load(std::memory_order_relaxed) && directory_.valid();
     if (inFile)
         writeToFile(line);
-    if (!inFile || foreground_ == Foreground::yes)
+    const bool inJournal = writeToJournal(level, function, message);
+    if (!inJournal && (!inFile || foreground_ == Foreground::yes))
         writeToStandardError(level, line);
 }
 
+bool RotatingLog::writeToJournal(int level, std::string_view function, std::string_view message) const {
+    return journal_.isConnected() &&
+           journal_.write({.level = level, .function = function, .message = message.substr(0, lineBytesMax)});
+}
+
 void RotatingLog::writeToSystemLog(int priority, std::string_view message) {
+    if (writeToJournal(LOG_PRI(priority), "log", message))
+        return;
     std::string text;
     plist::appendEscaped(text, message.substr(0, lineBytesMax));
     ::syslog(LOG_DAEMON | LOG_PRI(priority), "%s", text.c_str());

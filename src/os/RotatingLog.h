@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // The daemon's log: one file of bounded size, or a few of them in rotation, and standard error beside it or in its
-// place.
+// place. Under a service manager that leads standard error to the system journal, each line goes there, too.
 //
 // Invariants: a file never grows beyond its size; a line is one write(2) and lies in one file; a line that could not be
 // written whole leaves nothing behind (it is counted, and the next one that can be written is preceded by one that says
@@ -14,6 +14,7 @@
 
 #include "base/Mutex.h"
 #include "os/FileDescriptor.h"
+#include "os/Journal.h"
 #include "platform/PlatformLog.h"
 
 #include <atomic>
@@ -30,7 +31,10 @@ class RotatingLog final : public PlatformLog {
 public:
     /// `yes`: every line also goes to standard error.
     enum class Foreground { no, yes };
-    explicit RotatingLog(Foreground foreground, int standardError = 2);
+    /// What the journal takes is not written to standard error, which it would read, too.
+    explicit RotatingLog(Foreground foreground, int standardError = 2)
+        : RotatingLog(foreground, standardError, Journal::ofEnvironment(standardError)) {}
+    RotatingLog(Foreground foreground, int standardError, Journal journal);
 
     bool open(std::string_view name, int level) override;
     [[nodiscard]] bool isOpen() const override { return open_.load(std::memory_order_acquire); }
@@ -48,6 +52,9 @@ private:
     void rotate() ZOR_REQUIRES(mutex_);
     [[nodiscard]] std::string fileName(unsigned index) const ZOR_REQUIRES(mutex_);
     void writeToFile(const std::string& line) ZOR_REQUIRES(mutex_);
+    /// Whether the line is there.
+    bool writeToJournal(int level, std::string_view function, std::string_view message) const;
+    void sayNoFile(const std::string& path) const ZOR_REQUIRES(mutex_);
     /// False, and `error_` says why, when nothing of the line is in the file.
     [[nodiscard]] bool append(const std::string& line) ZOR_REQUIRES(mutex_);
     void lose() ZOR_REQUIRES(mutex_);
@@ -57,6 +64,7 @@ private:
 
     const Foreground foreground_;
     const int standardError_;
+    const Journal journal_;
     std::atomic<bool> open_{false};
     std::atomic<int> level_{0};
     std::atomic<std::uint64_t> linesLost_{0};

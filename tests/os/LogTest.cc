@@ -1,14 +1,21 @@
 // SPDX-License-Identifier: Apache-2.0
+#include "base/LogSubject.h"
+#include "base/ZORError.h"
 #include "os/RotatingLog.h"
 #include "plist/Text.h"
 #include "support/TestRoot.h"
 #include "support/Waiting.h"
 
+#include <algorithm>
 #include <csignal>
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <initializer_list>
+#include <optional>
 #include <sstream>
 #include <sys/resource.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 
 namespace zor::platform {
 namespace {
@@ -174,6 +181,56 @@ TEST(RotatingLog, WritesToStandardErrorWithoutWaitingForever) {
         log.write("nobody reads this line of the log any more", 5);
     EXPECT_LT(std::chrono::steady_clock::now() - begun, std::chrono::seconds(5));
     EXPECT_EQ(log.lines().size(), 3001U);
+}
+
+// Goal: in the journal a line has its fields and a priority by which errors can be told from what clients do wrong, and
+// it is said once. Method: a socket in the journal's place, a table of lines, and a pipe as standard error.
+TEST(Journal, TellsErrorsFromWhatClientsDoWrong) {
+    const TestRoot root;
+    const FileDescriptor listening(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+    sockaddr_un address{.sun_family = AF_UNIX, .sun_path = {}};
+    root.path("journal").copy(address.sun_path, sizeof address.sun_path - 1);
+    ASSERT_EQ(::bind(listening.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    int ends[2];
+    ASSERT_EQ(::pipe2(ends, O_CLOEXEC | O_NONBLOCK), 0);
+    const FileDescriptor reading(ends[0]);
+    const FileDescriptor standardError(ends[1]);
+    RotatingLog sink(RotatingLog::Foreground::yes, standardError.get(), Journal::at(root.path("journal")));
+    ASSERT_TRUE(sink.open("com.veltra.zorvaned", 5));
+    const Log log(sink);
+    const std::function<void(const LogSubject::Take&)> request = [](const LogSubject::Take& take) {
+        take("ZORVANE_IDENTIFIER", "a\nPRIORITY=0");
+    };
+    struct Row {
+        std::optional<ErrorCode> code;
+        bool isClients;
+        const char* priority;
+    };
+    for (const auto& [code, isClients, priority] : std::initializer_list<Row>{
+             {std::nullopt, false, "PRIORITY=3"},
+             {std::nullopt, true, "PRIORITY=4"},
+             {ErrorCode::notFound, true, "PRIORITY=5"},
+             {ErrorCode::notEntitled, true, "PRIORITY=5"},
+             {ErrorCode::propertyListNotWritten, true, "PRIORITY=3"},
+         }) {
+        std::optional<LogRequestScope> asked;
+        if (isClients)
+            asked.emplace(request);
+        if (code)
+            (void)makeError(log, {"f", 7}, *code, nullptr, LogFlag::yes, "two\nlines");
+        else
+            log.write(3, "f", "two\nlines");
+        char entry[1024];
+        const ssize_t bytes = ::recv(listening.get(), entry, sizeof entry, MSG_DONTWAIT);
+        ASSERT_GT(bytes, 0);
+        const auto fields = linesOf({entry, static_cast<std::size_t>(bytes)});
+        EXPECT_EQ(fields.front(), priority);
+        EXPECT_EQ(fields.back(), code ? "MESSAGE=7: two\\nlines" : "MESSAGE=two\\nlines");
+        EXPECT_EQ(std::ranges::count(fields, "ZORVANE_IDENTIFIER=a\\nPRIORITY=0"), isClients ? 1 : 0);
+        EXPECT_EQ(std::ranges::count(fields, "CODE_FUNC=f"), 1);
+    }
+    char byte = 0;
+    EXPECT_EQ(::read(reading.get(), &byte, 1), -1) << "said twice";
 }
 
 } // namespace
