@@ -17,8 +17,8 @@ namespace {
 constexpr std::int64_t lookEveryMilliseconds = 1000;
 /// A crowd of unknown peers must not have the registry looked at for each of them.
 constexpr std::int64_t lookAgainMilliseconds = 20;
-/// All files together; one of the usual size takes some hundred bytes.
-constexpr std::size_t allBytesMax = std::size_t{64} << 20;
+/// A file that somebody writes, and has not closed, may be wrong for so long without its being said.
+constexpr std::int64_t writingNanosecondsMax = 2'000'000'000;
 constexpr int levelError = 3;
 
 std::shared_ptr<const RegistryEntry> entryNamed(const IdentityRegistry::Snapshot& snapshot, const std::string& name) {
@@ -94,9 +94,10 @@ void IdentityRegistry::look(Read read) {
     // taken.
     if (!hasLooked_)
         read = Read::all;
-    else if (read == Read::changed && looksUnchanged(*snapshot()))
+    else if (read == Read::changed && !holdsBack_ && looksUnchanged(*snapshot()))
         return;
     hasLooked_ = false;
+    holdsBack_ = false;
     // A watch comes before the look at what it watches: what changes in between is then told, and read once more.
     watches_.begin();
     watches_.watchRegistry();
@@ -130,7 +131,7 @@ std::vector<IdentityRegistry::Registered> IdentityRegistry::readEntries(const Re
                                                                         std::vector<RegistryProblem>& problems) {
     std::vector<Registered> entries;
     const auto old = snapshot();
-    std::size_t bytesLeft = allBytesMax;
+    std::size_t bytesLeft = RegistryDirectory::allBytesMax;
     for (const auto& [name, stamp] : listing.files) {
         const auto before = listing_.files.find(name);
         auto entry = entryNamed(*old, name);
@@ -144,6 +145,11 @@ std::vector<IdentityRegistry::Registered> IdentityRegistry::readEntries(const Re
         if (read == Read::all || !isAsBefore) {
             auto parsed = directory_.read(listing, name);
             if (!parsed) {
+                // One that is being copied there will be read again when it is whole.
+                if (!parsed.error().isShortage && isBeingWritten(name, stamp)) {
+                    holdsBack_ = true;
+                    continue;
+                }
                 problems.push_back({.text = formatted("%s is ignored: %s", name.c_str(), parsed.error().text.c_str()),
                                     .isShortage = parsed.error().isShortage});
                 continue;
@@ -155,6 +161,13 @@ std::vector<IdentityRegistry::Registered> IdentityRegistry::readEntries(const Re
         entries.push_back({.fileName = name, .entry = std::move(entry), .executable = {}});
     }
     return entries;
+}
+
+bool IdentityRegistry::isBeingWritten(const std::string& name, const FileStamp& stamp) const {
+    timespec now{};
+    ::clock_gettime(CLOCK_REALTIME, &now);
+    const std::int64_t age = std::int64_t{now.tv_sec} * 1'000'000'000 + now.tv_nsec - stamp.changedNanoseconds;
+    return age < writingNanosecondsMax && watches_.isBeingWritten(name);
 }
 
 void IdentityRegistry::uniteIdentifiers(std::vector<Registered>& entries) {

@@ -80,6 +80,7 @@ private:
     [[nodiscard]] bool looksUnchanged(const Snapshot& old) const ZOR_REQUIRES(reading_);
     [[nodiscard]] std::vector<Registered> readEntries(const RegistryListing& listing, Read read,
                                                       std::vector<RegistryProblem>& problems) ZOR_REQUIRES(reading_);
+    [[nodiscard]] bool isBeingWritten(const std::string& name, const FileStamp& stamp) const ZOR_REQUIRES(reading_);
     /// Tells each entry what all entries of its identifier grant together. One that knows it keeps its objects.
     static void uniteIdentifiers(std::vector<Registered>& entries);
     void publish(std::vector<Registered> entries) ZOR_REQUIRES(reading_);
@@ -98,6 +99,8 @@ private:
     std::int64_t lookedMilliseconds_ ZOR_GUARDED_BY(reading_) = 0;
     /// The last look was at everything that is published.
     bool hasLooked_ ZOR_GUARDED_BY(reading_) = false;
+    /// A file is wrong and was not spoken of: the next look reads it again.
+    bool holdsBack_ ZOR_GUARDED_BY(reading_) = false;
     const int noticeDescriptor_;
 
     mutable Mutex publishing_;

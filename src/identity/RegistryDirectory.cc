@@ -74,8 +74,8 @@ RegistryListing RegistryDirectory::list() const {
     return listing;
 }
 
-std::expected<RegistryEntry, RegistryProblem> RegistryDirectory::read(const RegistryListing& listing,
-                                                                      const std::string& name) const {
+std::expected<std::string, RegistryProblem> RegistryDirectory::bytes(const RegistryListing& listing,
+                                                                     const std::string& name) const {
     const auto file = openBeneath(listing.directory.get(), name.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY);
     if (!file)
         return std::unexpected(cannot("opened", file.error()));
@@ -86,10 +86,18 @@ std::expected<RegistryEntry, RegistryProblem> RegistryDirectory::read(const Regi
         return std::unexpected(RegistryProblem{.text = "is no regular file"});
     if (auto problem = ownershipProblem(status))
         return std::unexpected(std::move(*problem));
-    const auto bytes = readSmallFile(file->get(), fileBytesMax);
+    auto bytes = readSmallFile(file->get(), fileBytesMax);
     if (!bytes)
         return std::unexpected(cannot("read", bytes.error()));
-    auto parsed = parseIdentityFile({reinterpret_cast<const std::uint8_t*>(bytes->data()), bytes->size()});
+    return std::move(*bytes);
+}
+
+std::expected<RegistryEntry, RegistryProblem> RegistryDirectory::read(const RegistryListing& listing,
+                                                                      const std::string& name) const {
+    const auto content = bytes(listing, name);
+    if (!content)
+        return std::unexpected(content.error());
+    auto parsed = parseIdentityFile({reinterpret_cast<const std::uint8_t*>(content->data()), content->size()});
     if (!parsed)
         return std::unexpected(RegistryProblem{.text = std::move(parsed.error())});
     return std::move(*parsed);

@@ -60,10 +60,15 @@ class RegistryDirectory {
 public:
     static constexpr std::size_t fileBytesMax = std::size_t{1} << 20;
     static constexpr std::size_t filesMax = 1024;
+    /// All files together; one of the usual size takes some hundred bytes.
+    static constexpr std::size_t allBytesMax = std::size_t{64} << 20;
 
     RegistryDirectory(const SystemRoot& root, uid_t daemonUserId) : root_(root), daemonUserId_(daemonUserId) {}
 
     [[nodiscard]] RegistryListing list() const;
+    /// What is in a file that may be believed.
+    [[nodiscard]] std::expected<std::string, RegistryProblem> bytes(const RegistryListing& listing,
+                                                                    const std::string& name) const;
     [[nodiscard]] std::expected<RegistryEntry, RegistryProblem> read(const RegistryListing& listing,
                                                                      const std::string& name) const;
 

@@ -40,6 +40,7 @@ RegistryWatches::Noticed RegistryWatches::take() {
         return most;
     readInotify(inotify_.get(), [&](const inotify_event& event, std::string_view name) {
         most = std::max(most, judge(event, name));
+        followWriters(event, name);
         return true;
     });
     return most;
@@ -54,6 +55,19 @@ RegistryWatches::Noticed RegistryWatches::judge(const inotify_event& event, std:
     const Interest& interest = found->second;
     const bool isAboutItself = name.empty();
     return interest.everything || isAboutItself || interest.names.contains(name) ? interest.kind : Noticed::nothing;
+}
+
+void RegistryWatches::followWriters(const inotify_event& event, std::string_view name) {
+    const auto found = interests_.find(event.wd);
+    if ((event.mask & IN_Q_OVERFLOW) != 0)
+        beingWritten_.clear();
+    if (found == interests_.end() || !found->second.everything || name.empty())
+        return;
+    if ((event.mask & (IN_CREATE | IN_MODIFY)) != 0)
+        beingWritten_.emplace(name);
+    else if ((event.mask & (IN_CLOSE_WRITE | IN_MOVED_TO | IN_MOVED_FROM | IN_DELETE)) != 0)
+        if (const auto writer = beingWritten_.find(name); writer != beingWritten_.end())
+            beingWritten_.erase(writer);
 }
 
 void RegistryWatches::begin() {

@@ -28,6 +28,9 @@ public:
     /// Takes what is pending, without waiting.
     [[nodiscard]] Noticed take();
 
+    /// A file of the registry's directory that was made or written to, and has not been closed by its writer since.
+    [[nodiscard]] bool isBeingWritten(const std::string& name) const { return beingWritten_.contains(name); }
+
     // A new set of watches: begin, then whatever is to be watched, then end, which drops what is watched no more.
     // Watches that are in both sets never pause.
     void begin();
@@ -46,12 +49,14 @@ private:
     [[nodiscard]] Interest* watch(int directory, std::uint32_t events, Noticed kind);
     void watchNameAt(const std::string& path);
     [[nodiscard]] Noticed judge(const inotify_event& event, std::string_view name) const;
+    void followWriters(const inotify_event& event, std::string_view name);
 
     const SystemRoot& root_;
     const FileDescriptor inotify_;
     bool complete_ = true;
     std::map<int, Interest> interests_;
     std::map<int, Interest> interestsNew_;
+    std::set<std::string, std::less<>> beingWritten_;
 };
 
 } // namespace zor::platform

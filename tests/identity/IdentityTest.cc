@@ -9,6 +9,7 @@
 
 #include <algorithm>
 #include <atomic>
+#include <fstream>
 #include <functional>
 
 namespace zor::platform {
@@ -215,6 +216,27 @@ TEST(IdentityRegistry, FollowsChanges) {
     loop.stop();
     runner.join();
     world.registry.unfollow(loop);
+}
+
+// Goal: a file that is being copied into the registry is not called wrong before it is whole, nor a wrong one right.
+// Method: one written in two halves, with a look after each; then one that stays half.
+TEST(IdentityRegistry, SaysNothingOfAFileThatIsBeingWritten) {
+    PeerWorld world;
+    world.registerAs("0.plist", "agent", "first");
+    world.registry.takeNotices();
+    const auto written = [&](const char* name, bool isWhole) {
+        const std::string text = world.named("agent", "copied");
+        std::ofstream file(world.test.path(PeerWorld::pathOf(name)));
+        file << text.substr(0, text.size() / 2) << std::flush;
+        world.registry.takeNotices();
+        const std::size_t said = world.log.take().size();
+        file << (isWhole ? text.substr(text.size() / 2) : "");
+        file.close();
+        world.registry.takeNotices();
+        return std::pair(said, world.log.take().size());
+    };
+    EXPECT_EQ(written("a.plist", true), std::pair(std::size_t{0}, std::size_t{0}));
+    EXPECT_EQ(written("b.plist", false), std::pair(std::size_t{0}, std::size_t{1}));
 }
 
 // A new peer finds what was registered just before it came, also through a link, and nothing is leaked.
