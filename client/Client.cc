@@ -435,10 +435,10 @@ Result<Value> status(const ConnectOptions& options) {
     auto connection = Client::Connection::open(options, Client::Connection::Service::status);
     if (!connection)
         return std::unexpected(connection.error());
-    connection->startTime();
+    connection->startTime(connection->timeoutMilliseconds());
     const auto reply = connection->receive();
     if (!reply)
-        return std::unexpected(reply.error());
+        return std::unexpected(connection->explained(reply.error()));
     return Value{converted(reply->content)};
 }
 

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Connection.h"
 
+#include "Diagnosis.h"
 #include "ipc/Frame.h"
 #include "ipc/Keys.h"
 #include "ipc/Names.h"
@@ -8,6 +9,8 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <charconv>
+#include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
 #include <poll.h>
@@ -29,8 +32,7 @@ std::unexpected<Error> fail(Error::Kind kind, std::string message) {
 
 /// The same whether a request met the end or the wait for its reply did: why the daemon hung up it cannot say any more.
 std::unexpected<Error> ended() {
-    return fail(Error::Kind::refused, "zorvaned ended the connection without an answer: this program is not known to "
-                                      "it, or may not send the command, or the daemon stopped");
+    return fail(Error::Kind::refused, "zorvaned ended the connection without an answer");
 }
 
 std::string withReason(const std::string& what, int number) {
@@ -57,8 +59,43 @@ void limitConnecting(int socket, std::uint32_t timeoutMilliseconds) {
     (void)::setsockopt(socket, SOL_SOCKET, SO_SNDTIMEO, &limit, sizeof limit); // all zero: no limit
 }
 
-std::unexpected<Error> tooLate(std::uint32_t timeoutMilliseconds) {
-    return fail(Error::Kind::timedOut, "zorvaned did not answer within " + std::to_string(timeoutMilliseconds) + " ms");
+pid_t processBehind(int socket) {
+    ucred credentials{};
+    socklen_t length = sizeof credentials;
+    return ::getsockopt(socket, SOL_SOCKET, SO_PEERCRED, &credentials, &length) == 0 ? credentials.pid : -1;
+}
+
+constexpr const char* timeoutVariable = "ZORVANE_TIMEOUT_MILLISECONDS";
+/// A daemon that is well answers in milliseconds; one that waits for a disk gets time for that.
+constexpr std::uint32_t timeoutMillisecondsDefault = 60'000;
+
+std::optional<std::uint32_t> timeoutOfEnvironment() {
+    const char* const text = ::secure_getenv(timeoutVariable);
+    std::uint32_t milliseconds = 0;
+    if (!text)
+        return std::nullopt;
+    const char* const end = text + std::strlen(text);
+    const auto [last, failure] = std::from_chars(text, end, milliseconds);
+    return failure == std::errc() && last == end && end != text ? std::optional(milliseconds) : std::nullopt;
+}
+
+/// Commands that walk a tree of a client's, or wait for an unlock: nobody knows how long that takes.
+bool mayTakeLong(ipc::Command command) {
+    switch (command) {
+    case ipc::Command::replaceContainer:
+    case ipc::Command::stageContainersForDelete:
+    case ipc::Command::deleteContainersOnDeathRow:
+    case ipc::Command::recreateDefaultStructure:
+    case ipc::Command::recreateDefaultStructure2:
+    case ipc::Command::deleteContainer:
+    case ipc::Command::wipeEntitledPluginDataContainer:
+    case ipc::Command::wipeDataContainerContent:
+    case ipc::Command::setDataProtection:
+    case ipc::Command::getDiskUsage:
+        return true;
+    default:
+        return false;
+    }
 }
 
 constexpr std::size_t replyBytesFirst = std::size_t{64} * 1024;
@@ -81,19 +118,27 @@ Result<Client::Connection> Client::Connection::open(const ConnectOptions& option
     if (!socket.valid())
         return fail(Error::Kind::unreachable, withReason("cannot make a socket", errno));
     const sockaddr_un address = addressOf(path, name, directory.get());
-    limitConnecting(socket.get(), options.timeoutMilliseconds);
-    const bool connected = ::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
+    Connection connection(std::move(socket), options);
+    limitConnecting(connection.socket_.get(), connection.timeoutMilliseconds());
+    const bool connected =
+        ::connect(connection.socket_.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
     if (!connected && errno == EAGAIN)
-        return tooLate(options.timeoutMilliseconds);
+        return std::unexpected(whySilent(-1, connection.timeoutMilliseconds()));
     if (!connected)
         return fail(Error::Kind::unreachable, withReason("cannot reach zorvaned at " + path, errno));
-    return Connection(std::move(socket), options);
+    return connection;
 }
 
-void Client::Connection::startTime() {
+std::uint32_t Client::Connection::timeoutMilliseconds() const {
+    return options_.timeoutMilliseconds ? *options_.timeoutMilliseconds
+                                        : timeoutOfEnvironment().value_or(timeoutMillisecondsDefault);
+}
+
+void Client::Connection::startTime(std::uint32_t milliseconds) {
+    limitMilliseconds_ = milliseconds;
     deadline_.reset();
-    if (timeoutMilliseconds_ != 0)
-        deadline_ = Clock::now() + std::chrono::milliseconds(timeoutMilliseconds_);
+    if (milliseconds != 0)
+        deadline_ = Clock::now() + std::chrono::milliseconds(milliseconds);
 }
 
 Result<void> Client::Connection::waitFor(short events) {
@@ -106,7 +151,7 @@ Result<void> Client::Connection::waitFor(short events) {
         if (ready > 0)
             return {};
         if (ready == 0)
-            return tooLate(timeoutMilliseconds_);
+            return fail(Error::Kind::timedOut, "zorvaned did not answer in time");
         if (errno != EINTR)
             return fail(Error::Kind::unreachable, withReason("cannot wait for zorvaned", errno));
     }
@@ -185,14 +230,26 @@ Result<plist::Dictionary> Client::Connection::replyTo(std::uint64_t id) {
     }
 }
 
-Result<plist::Dictionary> Client::Connection::call(const plist::Dictionary& request) {
-    startTime();
+Error Client::Connection::explained(const Error& error) const {
+    if (error.kind == Error::Kind::refused)
+        return whyEnded(options_, std::chrono::duration_cast<std::chrono::milliseconds>(Clock::now() - connected_));
+    if (error.kind == Error::Kind::timedOut)
+        return whySilent(processBehind(socket_.get()), limitMilliseconds_);
+    return error;
+}
+
+Result<plist::Dictionary> Client::Connection::exchange(const plist::Dictionary& request) {
     const auto id = send(request);
-    if (!id)
-        return std::unexpected(id.error());
-    auto reply = replyTo(*id);
+    return id ? replyTo(*id) : std::unexpected(id.error());
+}
+
+Result<plist::Dictionary> Client::Connection::call(const plist::Dictionary& request) {
+    const auto command = static_cast<ipc::Command>(request.unsignedInteger(ipc::keys::command).value_or(0));
+    startTime(!options_.timeoutMilliseconds && mayTakeLong(command) ? timeoutOfEnvironment().value_or(0)
+                                                                    : timeoutMilliseconds());
+    auto reply = exchange(request);
     if (!reply)
-        return reply;
+        return std::unexpected(explained(reply.error()));
     const auto code = reply->unsignedInteger(ipc::keys::replyError);
     if (!code)
         return fail(Error::Kind::protocol, "the reply has no \"ReplyError\"");

@@ -30,19 +30,27 @@ public:
         zor::plist::Dictionary content;
     };
     [[nodiscard]] Result<Reply> receive();
-    /// Starts the time of a call.
-    void startTime();
+    /// Starts the time of a call; 0 is for ever.
+    void startTime(std::uint32_t milliseconds);
+    /// That of calls that walk no tree.
+    [[nodiscard]] std::uint32_t timeoutMilliseconds() const;
+    /// The same error, with what can be found out about it.
+    [[nodiscard]] Error explained(const Error& error) const;
 
 private:
     Connection(zor::platform::FileDescriptor socket, const ConnectOptions& options)
-        : socket_(std::move(socket)), timeoutMilliseconds_(options.timeoutMilliseconds) {}
+        : socket_(std::move(socket)), options_(options) {}
+    Result<zor::plist::Dictionary> exchange(const zor::plist::Dictionary& request);
     Result<std::uint64_t> send(const zor::plist::Dictionary& request);
     Result<zor::plist::Dictionary> replyTo(std::uint64_t id);
     Result<void> readAll(std::uint8_t* bytes, std::size_t count);
     Result<void> waitFor(short events);
 
     zor::platform::FileDescriptor socket_;
-    std::uint32_t timeoutMilliseconds_;
+    ConnectOptions options_;
+    Clock::time_point connected_ = Clock::now();
+    /// Of the call that goes on.
+    std::uint32_t limitMilliseconds_ = 0;
     std::optional<Clock::time_point> deadline_;
     std::uint64_t lastId_ = 0;
     std::map<std::uint64_t, zor::plist::Dictionary> early_;

@@ -163,7 +163,7 @@ nextBoot() {
     echo "\$ zorvaned --forget-boot"
     startDaemon --forget-boot
     [[ ! -e "$root/private/var/mobile/Containers/Data/Application/Junk" ]] || fail "the orphan is still there"
-    [[ -z "$("$binaries/zorvanectl" --root "$root" list --class data-app --user 501 --transient --json | tr -d '[]')" ]] ||
+    [[ -z "$("$binaries/zorvanectl" --root "$root" list --class data-app --user 501 --transient | tail -n +2)" ]] ||
         fail "a transient container outlived the boot"
     ctl status
 }

@@ -2,9 +2,9 @@
 #include "check/WorkCheck.h"
 
 #include "base/Format.h"
+#include "check/DeathRow.h"
 #include "device/LinkSandboxUserState.h"
 #include "fs/AtomicFile.h"
-#include "fs/FileSystemDeathRow.h"
 #include "fs/Names.h"
 #include "os/Names.h"
 #include "os/Openat2.h"
@@ -55,21 +55,7 @@ void WorkCheck::checkStaging() {
 }
 
 void WorkCheck::checkDeathRow() {
-    const FileURL deathRow = look_.device().places().deathrowDirectory();
-    if (const auto directory = look_.openDirectory(deathRow))
-        addDeathRowItems(directory->get(), deathRow);
-    // That of each other file system.
-    std::vector<FileURL> places = look_.device().places().placesOfSharedContainers();
-    for (const MobileUser& user : look_.users())
-        places.push_back(user.home);
-    std::set<std::pair<dev_t, ino_t>> seen;
-    for (const FileURL& place : places) {
-        const auto top = fs::topOfMount(look_.device().fileManager().resolver(), place);
-        if (!top || !seen.insert(top->identity).second)
-            continue;
-        if (const auto directory = fs::openDeathRow(top->directory.get()))
-            addDeathRowItems(directory->get(), fs::deathRowBelow(top->url));
-    }
+    forEachDeathRow(look_, [this](int directory, const FileURL& row) { addDeathRowItems(directory, row); });
 }
 
 void WorkCheck::addDeathRowItems(int directory, const FileURL& row) {

@@ -26,8 +26,8 @@ Keeps the containers of every application, extension and service of a device.
   --containers-per-user N
                    containers that one user may have before clients other than
                    the owner of the root can make no more; 100000 by default
-  --help           show this text
-  --version        show the version
+  -h, --help       show this text
+  -V, --version    show the version
 
 Set ZORVANE_DURABILITY=none to leave out syncs on a root that may be thrown away;
 it is ignored on /. Clients find the daemon at DIR/run/zorvane/com.veltra.zorvaned;
@@ -65,14 +65,14 @@ std::expected<DaemonOptions, OptionsEnd> parseDaemonOptions(int argumentCount, c
         {"forget-boot", no_argument, nullptr, 'b'},
         {"containers-per-user", required_argument, nullptr, 'c'},
         {"help", no_argument, nullptr, 'h'},
-        {"version", no_argument, nullptr, 'v'},
+        {"version", no_argument, nullptr, 'V'},
         {nullptr, 0, nullptr, 0},
     };
     DaemonOptions options;
     opterr = 0;
     optind = 0; // glibc: also forget where an earlier call stopped inside an argument
     for (;;) {
-        const int next = ::getopt_long(argumentCount, arguments, ":", known, nullptr);
+        const int next = ::getopt_long(argumentCount, arguments, ":hV", known, nullptr);
         switch (next) {
         case -1:
             if (optind < argumentCount)
@@ -97,7 +97,7 @@ std::expected<DaemonOptions, OptionsEnd> parseDaemonOptions(int argumentCount, c
             break;
         case 'h':
             return std::unexpected(OptionsEnd{help, 0});
-        case 'v':
+        case 'V':
             return std::unexpected(OptionsEnd{"zorvaned " ZORVANE_VERSION "\n", 0});
         case ':':
             return std::unexpected(usage(std::string("option '") + arguments[optind - 1] + "' needs a value"));

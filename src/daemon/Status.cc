@@ -5,6 +5,8 @@
 #include "ipc/Keys.h"
 #include "operations/ZORDataProtectionManager.h"
 
+#include <unistd.h>
+
 namespace zor {
 
 namespace powers = platform::entitlementKeys;
@@ -15,17 +17,17 @@ plist::Dictionary describe(const platform::Identity& identity) {
     plist::Dictionary peer{
         {"Pid", static_cast<std::int64_t>(identity.pid)},
         {"EffectiveUserID", identity.effectiveUserId},
-        {"Explanation", identity.explanation},
-        {"Known", identity.grant != nullptr},
+        {std::string(ipc::keys::peerExplanation), identity.explanation},
+        {std::string(ipc::keys::peerKnown), identity.grant != nullptr},
     };
     if (!identity.grant)
         return peer;
     if (identity.grant->identifier)
-        peer.set("Identifier", *identity.grant->identifier);
+        peer.set(ipc::keys::peerIdentifier, *identity.grant->identifier);
     peer.set("KernelAgent", identity.grant->kernelAgent);
     peer.set("OnlyOwnIdentifier", identity.grant->onlyOwnIdentifier);
     if (const auto& entitlements = identity.grant->entitlements) {
-        peer.set("MaySendEveryCommand", entitlements->isTrue(powers::allowed));
+        peer.set(ipc::keys::peerMaySendEveryCommand, entitlements->isTrue(powers::allowed));
         peer.set("MayLookUpOtherIdentifiers",
                  entitlements->isTrue(powers::allowed) || entitlements->isTrue(powers::otherIdLookup));
         peer.set("Entitlements", *entitlements);
@@ -37,7 +39,8 @@ plist::Dictionary describe(const platform::Identity& identity) {
 
 plist::Dictionary Status::forPeer(platform::Peer& peer, platform::StatusSocket::Detail detail) {
     plist::Dictionary status{
-        {std::string(ipc::keys::statusPeer), describe(peer.identify(platform::Peer::Explain::yes))}};
+        {std::string(ipc::keys::statusPeer), describe(peer.identify(platform::Peer::Explain::yes))},
+        {std::string(ipc::keys::statusDaemon), daemon()}};
     if (!composition_.platform().peers.ownsRoot(peer.kernelUserId()))
         return status;
     status.set(ipc::keys::statusCounters, counters());
@@ -46,6 +49,13 @@ plist::Dictionary Status::forPeer(platform::Peer& peer, platform::StatusSocket::
     else
         status.set(ipc::keys::statusEntitlementsLeftOut, true);
     return status;
+}
+
+plist::Dictionary Status::daemon() const {
+    const auto up = std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - started_);
+    return {{"Version", ZORVANE_VERSION},
+            {"Pid", static_cast<std::int64_t>(::getpid())},
+            {std::string(ipc::keys::daemonUptimeMilliseconds), static_cast<std::uint64_t>(up.count())}};
 }
 
 void Status::addEntitlements(plist::Dictionary& status) {

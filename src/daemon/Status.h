@@ -8,6 +8,7 @@
 #include "plist/Value.h"
 #include "service/StatusSocket.h"
 
+#include <chrono>
 #include <functional>
 
 namespace zor {
@@ -18,11 +19,12 @@ public:
     Status(Composition& composition, std::function<void(plist::Dictionary&)> platformCounters)
         : composition_(composition), platformCounters_(std::move(platformCounters)) {}
 
-    /// The dictionary for one peer: "Peer"; and, where the peer may know them, "Counters" and, in full detail, the
-    /// entitlement map and what it makes of groups.
+    /// The dictionary for one peer: "Peer" and "Daemon"; and, where the peer may know them, "Counters" and, in full
+    /// detail, the entitlement map and what it makes of groups.
     [[nodiscard]] plist::Dictionary forPeer(platform::Peer& peer, platform::StatusSocket::Detail detail);
 
 private:
+    [[nodiscard]] plist::Dictionary daemon() const;
     [[nodiscard]] plist::Dictionary counters();
     void addProtection(plist::Dictionary& counters);
     void addSetup(plist::Dictionary& counters);
@@ -30,6 +32,7 @@ private:
     void addEntitlements(plist::Dictionary& status);
 
     Composition& composition_;
+    const std::chrono::steady_clock::time_point started_ = std::chrono::steady_clock::now();
     const std::function<void(plist::Dictionary&)> platformCounters_;
 };
 

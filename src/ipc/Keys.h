@@ -98,8 +98,14 @@ inline constexpr std::string_view replyGroupContainerDict = "ReplyGroupContainer
 inline constexpr std::string_view replyGroupIdentifiersArray = "ReplyGroupIdentifiersArray"; // array
 
 // The status reply.
-inline constexpr std::string_view statusPeer = "Peer";         // dictionary
-inline constexpr std::string_view statusCounters = "Counters"; // dictionary
+inline constexpr std::string_view statusPeer = "Peer";                             // dictionary
+inline constexpr std::string_view peerKnown = "Known";                             // boolean
+inline constexpr std::string_view peerIdentifier = "Identifier";                   // string
+inline constexpr std::string_view peerExplanation = "Explanation";                 // string
+inline constexpr std::string_view peerMaySendEveryCommand = "MaySendEveryCommand"; // boolean
+inline constexpr std::string_view statusDaemon = "Daemon";                         // dictionary
+inline constexpr std::string_view daemonUptimeMilliseconds = "UptimeMilliseconds"; // u64
+inline constexpr std::string_view statusCounters = "Counters";                     // dictionary
 /// Dictionary: identifier to entitlements, and the keys that the entitlement map keeps for itself.
 inline constexpr std::string_view statusEntitlements = "Entitlements";
 /// Dictionary: "Application" and "System" to dictionaries of group identifier to an array of the identifiers that list

@@ -66,7 +66,8 @@ int adoptListenerSocket(int socket, int type) {
     if (flags < 0 || ::fcntl(socket, F_SETFL, flags | O_NONBLOCK) != 0 || ::fcntl(socket, F_SETFD, FD_CLOEXEC) != 0)
         return errno;
     refuseDescriptors(socket);
-    return 0;
+    // Clients are told by the kernel who listens: this process, not the one that made the socket.
+    return ::listen(socket, backlog) == 0 ? 0 : errno;
 }
 
 int enableSenderCredentials(int socket) {

@@ -82,6 +82,10 @@ std::string programPath(const std::string& name) {
     return ZORVANE_BINARY_DIR "/bin/" + name;
 }
 
+std::string packagingPath(const std::string& name) {
+    return ZORVANE_PACKAGING_DIR "/" + name;
+}
+
 std::string ownProgram() {
     return std::filesystem::read_symlink("/proc/self/exe");
 }

@@ -43,6 +43,8 @@ struct Outcome {
 Outcome runProgram(const std::vector<std::string>& words);
 /// Where the built programs lie.
 std::string programPath(const std::string& name);
+/// Where the sources of what is installed beside them lie.
+std::string packagingPath(const std::string& name);
 /// The program that asks.
 std::string ownProgram();
 

@@ -2,11 +2,14 @@
 // The daemon's life as its users see it: killed at any moment, started twice, told to stop, asked by its tool.
 #include "os/FileDescriptor.h"
 #include "process/DaemonProcess.h"
+#include "process/JsonSchema.h"
 #include "process/Relay.h"
 #include "support/LongRun.h"
 
+#include <algorithm>
 #include <atomic>
 #include <cerrno>
+#include <csignal>
 #include <cstring>
 #include <filesystem>
 #include <future>
@@ -15,6 +18,7 @@
 #include <random>
 #include <sched.h>
 #include <set>
+#include <sstream>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/syscall.h>
@@ -149,103 +153,272 @@ struct ToolCall {
     std::vector<std::string> arguments;
     int exitStatus;
     const char* inOutput;
+    /// Says it, too: what to do about a mistake.
+    const char* andDoes = "";
 };
+
+/// The name of the schema for what a call prints.
+std::string schemaOf(const ToolCall& row, const nlohmann::json& schemas, const nlohmann::json& document) {
+    if (document.contains("error"))
+        return "error";
+    std::string name;
+    for (const std::string& word : row.arguments)
+        for (const std::string& longer : {name + (name.empty() ? "" : " ") + word, word})
+            if (schemas.contains(longer) || longer == "info" || longer == "entitlements" || longer == "registry") {
+                name = longer;
+                break;
+            }
+    return name;
+}
+
 void expectCall(const DaemonProcess& daemon, const ToolCall& row) {
+    SCOPED_TRACE(::testing::PrintToString(row.arguments));
+    static const nlohmann::json schemas =
+        nlohmann::json::parse(readFile(packagingPath("schema/zorvanectl.schema.json")))["$defs"];
     std::vector<std::string> words = daemon.toolWords(row.arguments);
     if (!row.arguments.empty() && row.arguments[0] == "--root") // another than the daemon's
         words.erase(words.begin() + 1, words.begin() + 3);
     const auto outcome = runProgram(words);
-    EXPECT_EQ(outcome.exitStatus, row.exitStatus) << ::testing::PrintToString(row.arguments) << outcome.output;
-    EXPECT_NE(outcome.output.find(row.inOutput), std::string::npos)
-        << ::testing::PrintToString(row.arguments) << outcome.output;
+    EXPECT_EQ(outcome.exitStatus, row.exitStatus) << outcome.output;
+    EXPECT_NE(outcome.output.find(row.inOutput), std::string::npos) << outcome.output;
+    EXPECT_NE(outcome.output.find(row.andDoes), std::string::npos) << outcome.output;
+    if (std::ranges::find(row.arguments, "--json") == row.arguments.end())
+        return;
+    const auto document = nlohmann::json::parse(outcome.output, nullptr, false);
+    ASSERT_TRUE(document.is_object()) << outcome.output;
+    const std::string name = schemaOf(row, schemas, document);
+    ASSERT_TRUE(schemas.contains(name)) << name;
+    EXPECT_EQ(differenceFromSchema(schemas[name], document), "") << name << outcome.output;
 }
 
-// Goal: the tool's exit codes and outputs are what scripts rely on. Method: a table of calls on a real daemon.
+// Goal: the tool's exit codes and outputs are what scripts rely on, and its JSON what the installed schemas say.
+// Method: a table of calls on a real daemon.
 TEST(Tool, ExitCodesAndOutput) {
     DaemonProcess daemon;
     daemon.start();
     const std::string controls = "\302\23331m"; // would colour a terminal
     const std::vector<ToolCall> rows = {
-        {{"create", "a.b", "--class", "data-app", "--user", "501"}, 0, "a.b created"},
-        {{"lookup", "a.b", "--class", "2"}, 0, "a.b exists"},
+        {{"--json", "create", "a.b", "--class", "data-app", "--user", "mobile"}, 0, "\"existed\": false"},
+        {{"lookup", "a.b", "--class", "2", "-u", "current"}, 0, "a.b exists"},
         {{"--json", "lookup", "a.b", "--class", "Data/Application"}, 0, "\"existed\": true"},
-        {{"lookup", "nobody", "--class", "2"}, 1, "code 21"},
-        {{"--json", "lookup", "nobody", "--class", "2"}, 1, "\"code\": 21"},
-        {{"create", "a.b", "--class", "2", "--user", "99"}, 1, "code 38"},
-        {{"list", "--class", "data-app"}, 0, "a.b"},
-        {{"--json", "list", "--class", "bundle-app"}, 0, "[]"},
+        {{"create", "\346\227\245", "--class", "data-app", "--user", "second"}, 0, "created"},
+        {{"list", "--all"}, 0, "Data/Application  502 second  \346\227\245          /"},
+        {{"--json", "list", "--all", "--size", "--sort", "user"}, 0, "\"bytes\""},
+        {{"--json", "list", "--class", "bundle-app"}, 0, "\"containers\": []"},
+        {{"--json", "usage", "--all"}, 0, "\"totalBytes\""},
+        {{"usage", "--class", "data-app"}, 0, "KiB in 1 container"},
         {{"create", "tool", "--class", "bundle-app"}, 0, "tool created"},
-        {{"delete", "a.b", "x.y", "--class", "data-app", "--yes"}, 1, "nothing was deleted"},
-        {{"metadata", "a.b", "--class", "data-app"}, 0, "transient  no"},
-        {{"info", "set", "a.b", "k", "{\"deep\": [1, true]}", "--class", "data-app"}, 0, "a.b set"},
+        {{"--json", "metadata", "a.b", "--class", "data-app"}, 0, "\"transient\": false"},
+        {{"--json", "info", "set", "a.b", "k", "{\"deep\": [1, true]}", "--class", "data-app"}, 0, "\"set\""},
         {{"--json", "info", "get", "a.b", "k", "--class", "data-app"}, 0, "\"deep\""},
-        {{"info", "set", "a.b", "k", "null", "--class", "data-app"}, 2, "null"},
-        {{"info", "unset", "a.b", "k", "--class", "data-app"}, 0, "a.b unset"},
-        {{"info", "get", "a.b", "k", "--class", "data-app"}, 1, "code 24"},
-        {{"--json", "info", "list", "a.b", "--class", "data-app"}, 0, "{}"},
-        {{"repair", "a.b", "--class", "data-app"}, 0, "a.b repaired"},
-        {{"protect", "a.b", "2", "--class", "data-app"}, 1, "code 38"},
+        {{"--json", "info", "unset", "a.b", "k", "--class", "data-app"}, 0, "\"unset\""},
+        {{"--json", "info", "list", "a.b", "--class", "data-app"}, 0, "\"info\": {}"},
+        {{"--json", "repair", "a.b", "--class", "data-app"}, 0, "\"repaired\""},
         {{"--json", "lock-state", "1"}, 0, "\"locked\": true"},
-        {{"protect", "a.b", "1", "--class", "data-app", "--fail-if-locked"}, 1, "code 61"},
         {{"protect", "a.b", "1", "--class", "data-app", "--no-wait"}, 0, "a.b gets class 1"},
         {{"protection", "a.b", "--class", "data-app"}, 0, "1, waiting for the device to be unlocked"},
         {{"--json", "protection", "a.b", "--class", "data-app"}, 0, "\"waitsForUnlock\": true"},
         {{"lock-state", "0"}, 0, "unlocked"},
-        {{"protect", "a.b", "9", "--class", "data-app", "--third-party"}, 1, "code 38"},
-        {{"--root", "/", "lock-state", "1"}, 2, "the device's to set"},
-        {{"explain", "61"}, 0, "What to do"},
-        {{"explain", "10000"}, 2, "is no code"},
-        {{"regenerate", "a.b", "--class", "data-app"}, 0, "is now at"},
-        {{"usage", "--class", "data-app"}, 0, "a.b"},
-        {{"--json", "usage", "a.b", "--class", "data-app"}, 0, "\"bytes\""},
-        {{"usage", "x.y", "--class", "data-app"}, 1, "code 21"},
-        {{"wipe", "a.b", "--class", "data-app"}, 2, "--yes"},
-        {{"wipe", "a.b", "--class", "data-app", "--yes"}, 0, "a.b wiped"},
-        {{"replace", "a.b", "--class", "data-app", "--yes"}, 1, "no transient container"},
+        {{"--json", "protect", "a.b", "1", "--class", "data-app"}, 0, "\"pending\": false"},
+        {{"--json", "explain", "61"}, 0, "\"whatToDo\""},
+        {{"--json", "explain"}, 0, "\"codes\""},
+        {{"--json", "regenerate", "a.b", "--class", "data-app"}, 0, "\"path\""},
+        {{"info", "set", "a.b", "k", "v", "--class", "data-app"}, 0, "a.b set"},
+        {{"wipe", "a.b", "--class", "data-app"}, 2, "with info value k?"},
+        {{"--json", "wipe", "a.b", "--class", "data-app", "--yes"}, 0, "\"protectionClass\": 1", "\"classKept\": true"},
+        {{"lock-state", "1"}, 0, "locked"},
+        {{"wipe", "a.b", "--class", "data-app", "--yes", "--keep-class"}, 5, "class 1 of the container", "unlock"},
+        {{"wipe", "a.b", "--class", "data-app", "--yes"}, 0, "and has 3 now", "'zorvanectl protect' sets it again"},
+        {{"lock-state", "0"}, 0, "unlocked"},
         {{"create", "a.b", "--class", "data-app", "--transient"}, 0, "a.b created"},
-        {{"replace", "a.b", "--class", "data-app", "--yes"}, 0, "a.b replaced"},
-        {{"delete", "a.b", "--class", "data-app"}, 2, "--yes"},
-        {{"delete", "a.b", "--class", "data-app", "--yes"}, 0, "a.b deleted"},
-        {{"lookup", "a.b", "--class", "data-app"}, 1, "code 21"},
-        {{"empty-death-row"}, 0, "Death row is empty"},
-        {{"entitlements", "set", "a.b"}, 2, "no entitlements given"},
-        {{"entitlements", "set", "a.b", "--from", "/nowhere"}, 2, "cannot be read"},
+        {{"--json", "replace", "a.b", "--class", "data-app", "--yes"}, 0, "\"replaced\": true"},
+        {{"--json", "delete", "a.b", "--class", "data-app", "--yes"}, 0, "\"deleted\""},
+        {{"--json", "empty-death-row"}, 0, "\"emptied\": true"},
         {{"entitlements", "set", "a.b", "--app-group", "group.a", "--system-container"}, 0, "a.b registered"},
-        {{"entitlements", "set", "c.d", "--app-group", "group.a", "--parent", "a.b"}, 0, "c.d registered"},
+        {{"--json", "entitlements", "set", "c.d", "--app-group", "group.a", "--parent", "a.b"}, 0, "\"registered\""},
         {{"entitlements", "show", "a.b"}, 0, "child: c.d"},
         {{"--json", "entitlements", "show", "nobody"}, 0, "\"registered\": false"},
+        {{"--json", "entitlements", "list"}, 0, "\"a.b\""},
         {{"groups", "a.b"}, 0, "group.a"},
         {{"--json", "groups", "nobody"}, 0, "\"application\": {}"},
-        {{"system-path", "a.b"}, 0, "/Data/System/"},
-        {{"system-group-path", "systemgroup.com.veltra.fonts"}, 0, "/systemgroup.com.veltra.fonts"},
-        {{"system-group-path", "systemgroup.other"}, 1, "code 55"},
+        {{"--json", "system-path", "a.b"}, 0, "/Data/System/"},
+        {{"--json", "system-group-path", "systemgroup.com.veltra.fonts"}, 0, "/systemgroup.com.veltra.fonts"},
         {{"why", "a.b"}, 0, "2 references, by a.b c.d"},
+        {{"--json", "why", "--group", "group.a"}, 0, "\"c.d\""},
         {{"--json", "why", "a.b"}, 0, "\"systemContainerGoesWithIdentifier\": true"},
-        {{"entitlements", "clear", "a.b"}, 0, "a.b cleared"},
-        {{"--json", "list", "--class", "data-system"}, 0, "[]"},
+        {{"--json", "entitlements", "clear", "a.b"}, 0, "\"cleared\""},
+        {{"--json", "list", "--class", "data-system"}, 0, "\"containers\": []"},
         {{"why", "c.d"}, 0, "of application group group.a"},
-        {{"delete", "--class", "data-app"}, 2, "required"},
-        {{"status"}, 0, "MessagesServed"},
-        {{"--json", "status"}, 0, "\"Counters\""},
-        {{"lookup", "a.b"}, 2, "--class"},
-        {{"lookup", "a.b", "--class", "shared"}, 2, "no class"},
-        {{}, 2, "subcommand"},
+        {{"--json", "registry", "list"}, 0, "20-ctl.plist"},
+        {{"--json", "registry", "who", programPath("zorvanectl")}, 0, "org.example.20-ctl"},
+        {{"status"}, 0, "MessagesServed", "death row"},
+        {{"--json", "status"}, 0, "\"uptimeMilliseconds\""},
+        {{"list", "-h"}, 0, "Usage: zorvanectl list"},
+        {{"help", "info", "get"}, 0, "Usage: zorvanectl info get"},
+        {{"list", "--version"}, 0, "zorvanectl "},
         {{"--help"}, 0, "Examples"},
-        {{"--root", "/nowhere", "status"}, 3, "cannot reach zorvaned"},
-        {{"--root", "/nowhere", "--json", "list", "--class", "2"}, 3, "\"unreachable\""},
         {{"create", controls, "--class", "2"}, 0, "\\xc2\\x9b31m created"},
         {{"--json", "list", "--class", "2"}, 0, "\"\\u009b31m\""},
-        // With --json, what the tool itself refuses is JSON too.
-        {{"--json", "wipe", controls, "--class", "2"}, 2, "{\n  \"error\""},
-        {{"--json", "info", "set", "a.b", "k", "null", "--class", "2"}, 2, "{\n  \"error\""},
-        {{"--json", "entitlements", "set", "a.b"}, 2, "{\n  \"error\""},
-        {{"--json", "entitlements", "set", "a.b", "--from", "/nowhere"}, 2, "{\n  \"error\""},
-        {{"--json", "explain", "10000"}, 2, "{\n  \"error\""},
-        {{"--root", "/", "--json", "lock-state", "1"}, 2, "{\n  \"error\""},
-        {{"lookup", "--class", "--json"}, 2, "{\n  \"error\""},
     };
     for (const ToolCall& row : rows)
         expectCall(daemon, row);
+}
+
+// Goal: every mistake at the terminal is told with what was wrong and what to do, under the exit code that scripts tell
+// it by. Method: a table of mistakes, on a daemon that runs, one that is stopped, and none.
+TEST(Tool, MistakesAreAnswered) {
+    DaemonProcess daemon;
+    daemon.start();
+    expectCall(daemon, {{"create", "a.b", "--class", "2"}, 0, "created"});
+    const auto registered = [&](const std::string& entry) {
+        const std::string path = daemon.path("tmp/entry.plist");
+        writeFile(path, "<plist version=\"1.0\">\n<dict><key>Executable</key><string>/bin/sh</string>\n" + entry +
+                            "</dict></plist>");
+        return path;
+    };
+    const std::string stranger = daemon.path("tmp/zorvanectl");
+    std::filesystem::copy_file(programPath("zorvanectl"), stranger);
+    const ToolCall rows[] = {
+        {{}, 2, "'zorvanectl' needs a command", "help"},
+        {{"lst"}, 2, "'list' meant", "zorvanectl help"},
+        {{"info", "gte", "a.b", "k"}, 2, "'get' meant", "zorvanectl help info"},
+        {{"list", "--clas", "2"}, 2, "'--class' meant", "zorvanectl help list"},
+        {{"help", "lookpu"}, 2, "'lookup' meant", "--help"},
+        {{"lookup", "a.b"}, 2, "--class is required", "zorvanectl help lookup"},
+        {{"lookup", "a.b", "c.d", "-c", "2"}, 2, "no further word, such as 'c.d'", "help lookup"},
+        {{"lookup", "--class", "--json"}, 2, "\"error\"", "help lookup"},
+        {{"lookup", "", "--class", "2"}, 2, "it is empty", "help lookup"},
+        {{"lookup", "a.b", "--class", "dota-app"}, 2, "'data-application' meant", "--help"},
+        {{"lookup", "a.b", "--class", "shared"}, 2, "is no class", "--help"},
+        {{"lookup", "a.b", "--class", "2", "--user", "mobil"}, 2, "nor a user of", "a user's name"},
+        {{"--root", "/nowhere", "lookup", "a.b", "-c", "2", "-u", "mobile"}, 2, "cannot be opened", "name a user id"},
+        {{"list"}, 2, "--class is required, or --all", "--all for every one"},
+        {{"list", "--all", "--class", "2"}, 2, "excludes", "help list"},
+        {{"delete", "--class", "data-app"}, 2, "required", "help delete"},
+        {{"delete", "a.b", "--class", "2"}, 2, "Nothing was done", "--yes"},
+        {{"--json", "wipe", "a.b", "--class", "2"}, 2, "Nothing was done", "--yes"},
+        {{"delete", "a.b", "x.y", "--class", "2", "--yes"}, 1, "nothing was deleted", "create it"},
+        {{"lookup", "nobody", "--class", "2"}, 1, "code 21", "check identifier"},
+        {{"--json", "lookup", "nobody", "--class", "2"}, 1, "\"code\": 21", "\"exitCode\": 1"},
+        {{"usage", "x.y", "--class", "2"}, 1, "code 21", "create it"},
+        {{"replace", "a.b", "--class", "2", "--yes"}, 1, "no transient container", "transient"},
+        {{"info", "get", "a.b", "k", "--class", "2"}, 1, "code 24", "list the keys"},
+        {{"why", "--group", "nobodys"}, 1, "nobody is registered", "entitlements list"},
+        {{"create", "a.b", "--class", "2", "--user", "99"}, 9, "code 38", "501 to 510"},
+        {{"info", "set", "a.b", "k", "null", "--class", "2"}, 2, "null", "info unset"},
+        {{"protect", "a.b", "x", "--class", "2"}, 2, "'x' is no number", "help protect"},
+        {{"protect", "a.b", "2", "--class", "2"}, 9, "code 38", "0, 1 or 3"},
+        {{"system-group-path", "systemgroup.other"}, 9, "code 55", "register"},
+        {{"--root", "/", "--json", "lock-state", "1"}, 2, "the device's to set", "--root"},
+        {{"--json", "explain", "10000"}, 2, "is no code", "lists all"},
+        {{"entitlements", "set", "a.b"}, 2, "no entitlements given", "entitlements clear"},
+        {{"--json", "entitlements", "set", "a.b", "--from", "/nowhere"}, 2, "cannot be read", "JSON object"},
+        {{"install", "a.b", "-", "--class", "2", "--yes"}, 2, "standard input", "archive"},
+        {{"--root", "/nowhere", "status"}, 3, "cannot reach zorvaned", "start the daemon"},
+        {{"--root", "/nowhere", "--json", "list", "--class", "2"}, 3, "\"unreachable\"", "--root"},
+    };
+    for (const ToolCall& row : rows)
+        expectCall(daemon, row);
+    const std::string allowed = "<key>Entitlements</key><dict><key>com.veltra.private.Zorvane.allowed</key>";
+    struct Entry {
+        std::string text;
+        int exitStatus;
+        const char* says;
+    };
+    const Entry entries[] = {
+        {allowed + "<string>yes</string></dict>", 4, "is the string \"yes\", which grants nothing: write <true/>"},
+        {allowed + "<true/></dict>", 0, "it gives power, and has no \"UserIDs\""},
+        {"<key>Unti</key><string>a</string>", 4, "line 3, column 1: \"Unti\" is not a key of this file"},
+        {"<key>Unit</key", 4, "line 3, column"},
+    };
+    for (const auto& [entry, exitStatus, says] : entries) {
+        expectCall(daemon, {{"registry", "check", registered(entry)}, exitStatus, says});
+        expectCall(daemon, {{"--json", "registry", "check", registered(entry)}, exitStatus, "\"remarks\""});
+    }
+    expectCall(daemon, {{"registry", "who", "/bin/true"}, 1, "no file that counts names", "registry list"});
+    writeFile(daemon.path("etc/zorvane/identities.d/50-bad.plist"), "no list", 0666);
+    expectCall(daemon,
+               {{"registry", "list"}, 4, "50-bad.plist\n  it does not count: can be written to by others", "2 of 3"});
+    expectCall(daemon, {{"lock-state", "1"}, 0, "locked"});
+    expectCall(daemon, {{"protect", "a.b", "1", "--class", "2", "--fail-if-locked"}, 9, "code 61", "unlock it"});
+    const auto refused = runProgram({stranger, "--root", daemon.root(), "list", "--all"});
+    EXPECT_EQ(refused.exitStatus, 6);
+    EXPECT_NE(refused.output.find("no entry names " + stranger), std::string::npos) << refused.output;
+    daemon.registerProgram("30-stranger", stranger, "");
+    const auto weak = runProgram({stranger, "--root", daemon.root(), "list", "--all"});
+    EXPECT_EQ(weak.exitStatus, 6);
+    EXPECT_NE(weak.output.find("knows this program as org.example.30-stranger, but"), std::string::npos) << weak.output;
+    const auto full = runProgram({"/bin/sh", "-c", programPath("zorvanectl") + " --help >/dev/full"});
+    EXPECT_EQ(full.exitStatus, 8) << full.output;
+    ::kill(daemon.pid(), SIGSTOP);
+    expectCall(daemon, {{"--timeout", "200", "list", "--all"}, 7, "is stopped", "kill -CONT"});
+    ::kill(daemon.pid(), SIGCONT);
+}
+
+/// What a shell may put after these words.
+std::vector<std::string> completed(const DaemonProcess& daemon, std::vector<std::string> words, const char* typed) {
+    words.insert(words.begin(), {programPath("zorvanectl"), "__complete", "--root", daemon.root()});
+    words.emplace_back(typed);
+    std::vector<std::string> found;
+    std::istringstream lines(runProgram(words).output);
+    for (std::string line; std::getline(lines, line);)
+        found.push_back(line.substr(0, line.find('\t')));
+    return found;
+}
+
+// Goal: help, manual page, completion and schemas speak of the same commands and options, and completion knows what is
+// there, and no word that a shell would run. Method: what completion offers, command by command, looked up in the
+// others.
+TEST(Tool, HelpPageCompletionAndSchemasAgree) {
+    DaemonProcess daemon;
+    daemon.start();
+    std::string page = readFile(packagingPath("man/zorvanectl.1"));
+    std::erase(page, '\\');
+    const auto schemas = nlohmann::json::parse(readFile(packagingPath("schema/zorvanectl.schema.json")))["$defs"];
+    std::set<std::string> printing;
+    std::vector<std::vector<std::string>> left = {{}};
+    while (!left.empty()) {
+        const std::vector<std::string> words = std::move(left.back());
+        left.pop_back();
+        std::string name;
+        for (const std::string& word : words)
+            name += (name.empty() ? "" : " ") + word;
+        SCOPED_TRACE(name);
+        std::vector<std::string> asking = {"help"};
+        asking.insert(asking.end(), words.begin(), words.end());
+        const std::string help = daemon.tool(asking).output + daemon.tool({"--help"}).output;
+        for (const std::string& option : completed(daemon, words, "--")) {
+            EXPECT_NE(help.find(option), std::string::npos) << option;
+            EXPECT_NE(page.find(option), std::string::npos) << option;
+        }
+        const auto commands = completed(daemon, words, "");
+        const bool isGroup = words.empty() || name == "info" || name == "entitlements" || name == "registry";
+        for (std::size_t i = 0; isGroup && i < commands.size(); ++i) {
+            left.push_back(words);
+            left.back().push_back(commands[i]);
+        }
+        if (isGroup || name == "help")
+            continue;
+        EXPECT_NE(page.find(name), std::string::npos);
+        printing.insert(name);
+    }
+    std::set<std::string> described = {"error"};
+    for (const auto& [name, schema] : schemas.items())
+        described.insert(name);
+    printing.insert("error");
+    EXPECT_EQ(printing, described);
+    expectCall(daemon, {{"create", "org.plain", "--class", "2"}, 0, "created"});
+    expectCall(daemon, {{"create", "$(touch x)", "--class", "2"}, 0, "created"});
+    expectCall(daemon, {{"entitlements", "set", "a.b", "--app-group", "group.a"}, 0, "registered"});
+    using Words = std::vector<std::string>;
+    EXPECT_EQ(completed(daemon, {"lookup"}, ""), Words{"org.plain"});
+    EXPECT_EQ(completed(daemon, {"why", "-g"}, "gr"), Words{"group.a"});
+    const auto shell =
+        runProgram({"/bin/bash", "-c",
+                    "PATH=" + programPath("") + ":$PATH; . " + packagingPath("completions/zorvanectl.bash") +
+                        "; COMP_WORDS=(zorvanectl --root " + daemon.root() +
+                        " lookup org); COMP_CWORD=4; _zorvanectl; echo \"${COMPREPLY[@]}\""});
+    EXPECT_EQ(shell.output, "org.plain\n");
 }
 
 // Goal: a change of protection class that waits for an unlock ends with the daemon: its client hears so, nothing of it
@@ -272,7 +445,7 @@ TEST(Life, KilledWhileAChangeOfProtectionWaits) {
     daemon.kill();
     const auto answer = waiting.get();
     ASSERT_FALSE(answer);
-    EXPECT_EQ(answer.error().kind, zorvane::Error::Kind::refused) << answer.error().message;
+    EXPECT_EQ(answer.error().kind, zorvane::Error::Kind::unreachable) << answer.error().message;
     daemon.start();
     expectCall(daemon, {show, 0, "\"pending\": null"});
     expectCall(daemon, {show, 0, "\"recorded\": 3"});

@@ -2,9 +2,8 @@
 #include "Options.h"
 
 #include "Failure.h"
+#include "identity/UserNumber.h"
 
-#include <charconv>
-#include <cstring>
 #include <getopt.h>
 
 namespace zorvanerun {
@@ -12,13 +11,13 @@ namespace zorvanerun {
 namespace {
 
 constexpr const char* help =
-    R"(Usage: zorvane-run [OPTION]... --identifier ID --user N [--] PROGRAM [ARGUMENT]...
+    R"(Usage: zorvane-run [OPTION]... --identifier ID --user USER [--] PROGRAM [ARGUMENT]...
 
-Runs a program as user N in a sandbox that holds the containers of its identifier,
+Runs a program as a user in a sandbox that holds the containers of its identifier,
 a read-only system, and nothing else of any user. What is missing is made.
 
   --identifier ID        whose containers: data, groups, system
-  --user N               user id (and group id) that the program runs with
+  --user USER            user id or name that the program runs with; its group has the same number
   --app-group G          this application group, and no other; may repeat
   --system-group G       this system group, and no other; may repeat
   --system-container ID  fail unless ID, which is the identifier, owns a system container
@@ -29,7 +28,7 @@ a read-only system, and nothing else of any user. What is missing is made.
   --wait                 wait while the daemon keeps the program from being started
   --dry-run              say what would be mounted, run nothing
   --json                 the same, and errors, as JSON
-  --help, --version
+  -h, --help; -V, --version
 
 Without a group named, all those registered for the identifier are there; one that is
 named has to be registered ('zorvanectl entitlements set'), since the next boot deletes
@@ -57,17 +56,22 @@ constexpr std::uint32_t rootUser = 0;
 constexpr std::uint32_t currentUserPlaceholder = 1;
 
 OptionsEnd usage(const std::string& what) {
-    return {.text = "zorvane-run: " + printable(what) + "\n  What to do: see 'zorvane-run --help'.\n",
-            .exitCode = exitFailure};
+    return {.text = what, .exitCode = exitFailure};
 }
 
-/// A user that a program may become.
-bool parseUser(const char* text, std::uint32_t& user) {
-    const char* const end = text + std::strlen(text);
-    const auto [last, error] = std::from_chars(text, end, user);
+/// Puts in the user that a program may become; nullopt when there is one.
+std::optional<OptionsEnd> findUser(Options& options) {
+    const auto root = zor::platform::SystemRoot::open(options.root);
+    if (!root)
+        return usage(withReason("the root " + options.root + " cannot be opened", root.error()));
+    const auto user = zor::platform::userNumberOf(*root, options.userText);
+    if (!user)
+        return usage(user.error());
+    options.user = *user;
     // The largest number is what the kernel takes for "leave it as it is".
-    return error == std::errc() && last == end && user != rootUser && user != currentUserPlaceholder &&
-           user != UINT32_MAX;
+    if (*user == rootUser || *user == currentUserPlaceholder || *user == UINT32_MAX)
+        return usage("'" + options.userText + "' is no user that a program can be run as");
+    return std::nullopt;
 }
 
 enum Option : int {
@@ -82,9 +86,7 @@ enum Option : int {
     bubblewrap,
     dryRun,
     wait,
-    json,
-    helpText,
-    version
+    json
 };
 
 constexpr option known[] = {
@@ -100,8 +102,8 @@ constexpr option known[] = {
     {"dry-run", no_argument, nullptr, Option::dryRun},
     {"wait", no_argument, nullptr, Option::wait},
     {"json", no_argument, nullptr, Option::json},
-    {"help", no_argument, nullptr, Option::helpText},
-    {"version", no_argument, nullptr, Option::version},
+    {"help", no_argument, nullptr, 'h'},
+    {"version", no_argument, nullptr, 'V'},
     {nullptr, 0, nullptr, 0},
 };
 
@@ -115,9 +117,8 @@ std::optional<OptionsEnd> take(int option, const char* value, const char* argume
         options.identifier = value;
         return std::nullopt;
     case Option::user:
-        if (parseUser(value, options.user))
-            return std::nullopt;
-        return usage("'" + std::string(value) + "' is no user that a program can be run as");
+        options.userText = value;
+        return std::nullopt;
     case Option::appGroup:
         options.applicationGroups.emplace_back(value);
         return std::nullopt;
@@ -148,9 +149,9 @@ std::optional<OptionsEnd> take(int option, const char* value, const char* argume
     case Option::json:
         options.json = true;
         return std::nullopt;
-    case Option::helpText:
+    case 'h':
         return OptionsEnd{.text = help, .exitCode = exitDone};
-    case Option::version:
+    case 'V':
         return OptionsEnd{.text = "zorvane-run " ZORVANE_VERSION "\n", .exitCode = exitDone};
     case ':':
         return usage("option '" + std::string(argument) + "' needs a value");
@@ -177,16 +178,18 @@ std::expected<Options, OptionsEnd> parseOptions(int argumentCount, char** argume
     opterr = 0;
     optind = 0; // glibc: also forget where an earlier call stopped inside an argument
     // The plus: the first word that is no option is the program, and what follows is the program's.
-    for (int next = 0; (next = ::getopt_long(argumentCount, arguments, "+:", known, nullptr)) != -1;)
+    for (int next = 0; (next = ::getopt_long(argumentCount, arguments, "+:hV", known, nullptr)) != -1;)
         if (auto end = take(next, optarg, arguments[optind - 1], options))
             return std::unexpected(std::move(*end));
     options.command.assign(arguments + optind, arguments + argumentCount);
     if (options.identifier.empty())
         return std::unexpected(usage("--identifier is missing, or empty"));
-    if (options.user == rootUser)
-        return std::unexpected(usage("--user is missing"));
+    if (options.userText.empty())
+        return std::unexpected(usage("--user is missing, or empty"));
     if (options.command.empty() || options.command.front().empty())
         return std::unexpected(usage("no program is named"));
+    if (auto end = findUser(options))
+        return std::unexpected(std::move(*end));
     return options;
 }
 

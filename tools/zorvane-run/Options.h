@@ -22,6 +22,8 @@ struct Options {
     std::string root = "/";
     std::string identifier;
     std::uint32_t user = 0;
+    /// As it was given: a number or a name.
+    std::string userText;
     // Named by hand; none: all that are registered.
     std::vector<std::string> applicationGroups;
     std::vector<std::string> systemGroups;
@@ -39,7 +41,7 @@ struct Options {
     std::vector<std::string> command;
 };
 
-/// What is to be said instead of running, and the exit code for it: help on standard output, errors on standard error.
+/// What is to be said instead of running, and the exit code for it: a whole text, or what is wrong.
 struct OptionsEnd {
     std::string text;
     int exitCode = 0;

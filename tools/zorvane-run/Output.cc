@@ -17,6 +17,9 @@ std::string dumped(const nlohmann::json& document) {
     return document.dump(2, ' ', true, nlohmann::json::error_handler_t::replace);
 }
 
+/// As zorvanectl's: a key may come with the same number; one that goes or means something else raises it.
+constexpr int jsonVersion = 1;
+
 nlohmann::json asJson(const Options& options, const std::vector<Mount>& mounts, const ToldContainers& told) {
     nlohmann::json list = nlohmann::json::array();
     for (const Mount& mount : mounts) {
@@ -27,7 +30,8 @@ nlohmann::json asJson(const Options& options, const std::vector<Mount>& mounts, 
             row["linkTarget"] = mount.linkTarget;
         list.push_back(std::move(row));
     }
-    return {{"identifier", options.identifier},
+    return {{"version", jsonVersion},
+            {"identifier", options.identifier},
             {"user", options.user},
             {"home", told.data},
             {"temporary", told.temporary},
@@ -41,18 +45,33 @@ nlohmann::json asJson(const Options& options, const std::vector<Mount>& mounts, 
 
 int sayFailure(const Options& options, const Failure& failure) {
     if (options.json)
-        std::fprintf(stderr, "%s\n",
-                     dumped({{"error", {{"message", failure.what}, {"advice", failure.advice}}}}).c_str());
+        std::fprintf(
+            stderr, "%s\n",
+            dumped({{"version", jsonVersion},
+                    {"error",
+                     {{"kind", "local"},
+                      {"message", failure.what},
+                      {"advice", failure.advice},
+                      {"while", options.identifier.empty() ? "read the command line" : "run " + options.identifier},
+                      {"exitCode", exitFailure}}}})
+                .c_str());
     else
         std::fprintf(stderr, "zorvane-run: %s\n  What to do: %s.\n", printable(failure.what).c_str(),
                      printable(failure.advice).c_str());
     return exitFailure;
 }
 
+bool outputReached() {
+    if (std::fflush(stdout) == 0 && std::ferror(stdout) == 0)
+        return true;
+    std::fputs("zorvane-run: standard output cannot be written to\n", stderr);
+    return false;
+}
+
 int showPlan(const Options& options, const std::vector<Mount>& mounts, const ToldContainers& told) {
     if (options.json) {
         std::printf("%s\n", dumped(asJson(options, mounts, told)).c_str());
-        return exitDone;
+        return outputReached() ? exitDone : exitFailure;
     }
     std::printf("%s would run as user %u, in %s, with %s network and\n", printable(options.command.front()).c_str(),
                 options.user, printable(told.data).c_str(), options.network == Network::host ? "the host's" : "no");
@@ -65,7 +84,7 @@ int showPlan(const Options& options, const std::vector<Mount>& mounts, const Tol
         std::printf("  %-5s  %-17s  %-*s  %s%s\n", access, kindName(mount.kind), static_cast<int>(width),
                     printable(mount.identifier).c_str(), printable(mount.path).c_str(), printable(target).c_str());
     }
-    return exitDone;
+    return outputReached() ? exitDone : exitFailure;
 }
 
 } // namespace zorvanerun

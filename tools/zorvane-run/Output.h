@@ -11,6 +11,8 @@ namespace zorvanerun {
 
 /// Says what failed and what to do. The exit code for it.
 [[nodiscard]] int sayFailure(const Options& options, const Failure& failure);
+/// Whether all that was printed until now has reached standard output; says so where it has not.
+[[nodiscard]] bool outputReached();
 /// What would be mounted, with which environment, for which program.
 [[nodiscard]] int showPlan(const Options& options, const std::vector<Mount>& mounts, const ToldContainers& told);
 

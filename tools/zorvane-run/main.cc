@@ -95,6 +95,18 @@ Result<int> run(const Options& options) {
     return showPlan(options, prepared->mounts, prepared->told);
 }
 
+/// A command line that cannot be parsed may still say how that is to be told.
+int sayEnd(const OptionsEnd& end, int argumentCount, char** arguments) {
+    if (end.exitCode == exitDone) {
+        std::fputs(end.text.c_str(), stdout);
+        return outputReached() ? exitDone : exitFailure;
+    }
+    Options options;
+    options.json = std::any_of(arguments, arguments + argumentCount,
+                               [](const char* word) { return std::strcmp(word, "--json") == 0; });
+    return sayFailure(options, {.what = end.text, .advice = "see 'zorvane-run --help'"});
+}
+
 } // namespace
 
 int main(int argumentCount, char** arguments) {
@@ -102,10 +114,8 @@ int main(int argumentCount, char** arguments) {
         ::_exit(runInside(argumentCount, arguments)); // there is nothing to be tidied up in the sandbox
     std::signal(SIGXFSZ, SIG_IGN);                    // a file that may not grow is an error to be told, not an end
     const auto options = parseOptions(argumentCount, arguments);
-    if (!options) {
-        std::fputs(options.error().text.c_str(), options.error().exitCode == exitDone ? stdout : stderr);
-        return options.error().exitCode;
-    }
+    if (!options)
+        return sayEnd(options.error(), argumentCount, arguments);
     const auto exitCode = run(*options);
     return exitCode ? *exitCode : sayFailure(*options, exitCode.error());
 }

@@ -48,7 +48,7 @@ CheckOptions optionsFor(const CheckedSystem& system, const zorvane::ConnectOptio
     if (!system.daemonRuns())
         return options;
     zorvane::ConnectOptions quick = connect;
-    if (quick.timeoutMilliseconds == 0)
+    if (quick.timeoutMilliseconds.value_or(0) == 0)
         quick.timeoutMilliseconds = statusMillisecondsMax;
     const auto status = zorvane::status(quick);
     if (!status)

@@ -23,26 +23,43 @@ struct Target {
 
 /// Whether what destroys something is done: asked on a terminal, or said beforehand with --yes.
 enum class Consent { ask, given };
+/// Whether a container's data-protection class, where it cannot be set again after its content went, keeps the content
+/// from going.
+enum class KeepClass { ifPossible, always };
 
 // ContainerCommands.cc
 int create(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
 int lookup(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
-int list(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
 /// Those of a class; all of them are there, or none goes.
 int deleteContainers(const zorvane::ConnectOptions& connect, const Output& output, const Target& target,
                      const std::vector<std::string>& identifiers, Consent consent);
 int emptyDeathRow(const zorvane::ConnectOptions& connect, const Output& output);
+
+// ListCommands.cc
+struct Listing {
+    /// Every class and every user, not those of the target.
+    bool all = false;
+    bool withPath = false;
+    bool withSize = false;
+    /// "class", "identifier", "user" or "size"; empty: the command's own order.
+    std::string order;
+};
+/// The target names no identifier.
+int list(const zorvane::ConnectOptions& connect, const Output& output, const Target& target, const Listing& listing);
+/// Bytes of each container and of all together; of one alone where the target names its identifier.
+int usage(const zorvane::ConnectOptions& connect, const Output& output, const Target& target, const Listing& listing);
+
+// StatusCommand.cc
 int status(const zorvane::ConnectOptions& connect, const Output& output);
 
 // KnownContainerCommands.cc: a container that is there.
 /// Puts the transient container of an identifier in the place of its live one, or makes it that one.
 int replace(const zorvane::ConnectOptions& connect, const Output& output, const Target& target, Consent consent);
-int wipe(const zorvane::ConnectOptions& connect, const Output& output, const Target& target, Consent consent);
+int wipe(const zorvane::ConnectOptions& connect, const Output& output, const Target& target, KeepClass keep,
+         Consent consent);
 int metadata(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
 int repair(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
 int regenerate(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
-/// Without an identifier, all of the class.
-int usage(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
 int infoList(const zorvane::ConnectOptions& connect, const Output& output, const Target& target);
 int infoGet(const zorvane::ConnectOptions& connect, const Output& output, const Target& target, const std::string& key);
 /// `value` is JSON; what is no JSON is taken as a string.
@@ -53,9 +70,10 @@ int infoUnset(const zorvane::ConnectOptions& connect, const Output& output, cons
 
 // InstallCommand.cc
 struct InstallOptions {
-    /// An archive or a directory.
+    /// An archive or a directory; "-" is an archive on standard input.
     std::string source;
     ProgressForm progress = ProgressForm::none;
+    KeepClass keepClass = KeepClass::ifPossible;
 };
 /// Makes it the content of a container, in the place of the one that is there.
 int install(const zorvane::ConnectOptions& connect, const Output& output, const Target& target,
@@ -89,6 +107,12 @@ int check(const zorvane::ConnectOptions& connect, const Output& output, const Ch
 /// One code, the daemon's or a finding's; empty: all of them.
 int explain(const Output& output, const std::string& text);
 
+// RegistryCommands.cc
+/// Every file of the identity registry, and whether it counts; what is wrong is a finding.
+int registryList(const zorvane::ConnectOptions& connect, const Output& output);
+int registryCheck(const Output& output, const std::string& path);
+int registryWho(const zorvane::ConnectOptions& connect, const Output& output, const std::string& executable);
+
 // EntitlementCommands.cc
 struct Registration {
     std::string identifier;
@@ -102,6 +126,8 @@ struct Registration {
 };
 int setEntitlements(const zorvane::ConnectOptions& connect, const Output& output, const Registration& registration);
 int showEntitlements(const zorvane::ConnectOptions& connect, const Output& output, const std::string& identifier);
+/// The identifiers that have some.
+int listEntitlements(const zorvane::ConnectOptions& connect, const Output& output);
 int clearEntitlements(const zorvane::ConnectOptions& connect, const Output& output, const std::string& identifier);
 
 // GroupCommands.cc. An empty identifier is this program's own.
@@ -112,5 +138,7 @@ int systemGroupPath(const zorvane::ConnectOptions& connect, const Output& output
                     const std::string& identifier);
 /// Who holds the groups of an identifier, and what goes when it goes.
 int why(const zorvane::ConnectOptions& connect, const Output& output, const std::string& identifier);
+/// Who holds a group, application's or system's.
+int whyGroup(const zorvane::ConnectOptions& connect, const Output& output, const std::string& group);
 
 } // namespace zorvanectl

@@ -1,8 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
-// Making, finding, listing and deleting containers, and asking how the daemon is.
+// Making, finding and deleting containers.
 #include "Commands.h"
 #include "KnownContainer.h"
-#include "RegisteredEntitlements.h"
 
 #include <algorithm>
 
@@ -54,29 +53,6 @@ int lookup(const zorvane::ConnectOptions& connect, const Output& output, const T
     return createOrLookup(connect, output, target, false);
 }
 
-int list(const zorvane::ConnectOptions& connect, const Output& output, const Target& target) {
-    const std::string what = "list " + std::string(zorvane::containerClassName(target.containerClass));
-    auto client = zorvane::Client::connect(connect);
-    if (!client)
-        return output.error(client.error(), what);
-    auto containers = client->list(target.containerClass, userOf(target), target.transient);
-    if (!containers)
-        return output.error(containers.error(), what);
-    std::ranges::sort(*containers, {}, &zorvane::ListedContainer::identifier);
-    if (output.isJson()) {
-        nlohmann::json rows = nlohmann::json::array();
-        for (const auto& container : *containers)
-            rows.push_back({{"identifier", container.identifier}, {"uuid", zorvane::uuidText(container.uuid)}});
-        output.json(rows);
-        return exitDone;
-    }
-    std::vector<std::vector<std::string>> rows;
-    for (const auto& container : *containers)
-        rows.push_back({zorvane::uuidText(container.uuid), printable(container.identifier)});
-    output.table({"UUID", "IDENTIFIER"}, rows);
-    return exitDone;
-}
-
 int deleteContainers(const zorvane::ConnectOptions& connect, const Output& output, const Target& target,
                      const std::vector<std::string>& identifiers, Consent consent) {
     const std::string what = "delete from " + std::string(zorvane::containerClassName(target.containerClass));
@@ -114,9 +90,10 @@ int deleteContainers(const zorvane::ConnectOptions& connect, const Output& outpu
             output.line(printable(deletion.identifier) + " deleted");
     }
     if (output.isJson())
-        output.json({{"deleted", rows}, {"bytes", toJson(bytes)}});
+        output.json({{"deleted", rows}, {"bytes", toJson(bytes)}, {"waitsOnDeathRow", true}});
     else
-        output.line(amount);
+        output.line(amount + ". The files wait on death row until 'zorvanectl empty-death-row', the next replace, "
+                             "installation or wipe, or the next start of the daemon");
     return exitDone;
 }
 
@@ -130,21 +107,6 @@ int emptyDeathRow(const zorvane::ConnectOptions& connect, const Output& output) 
         output.json({{"emptied", true}});
     else
         output.line("Death row is empty");
-    return exitDone;
-}
-
-int status(const zorvane::ConnectOptions& connect, const Output& output) {
-    const auto answer = zorvane::status(connect);
-    if (!answer)
-        return output.error(answer.error(), "ask for the status");
-    if (output.isJson()) {
-        output.json(toJson(*answer));
-        return exitDone;
-    }
-    if (const auto* map = std::get_if<zorvane::Map>(&answer->content))
-        for (const auto& [key, value] : *map)
-            if (key != statusEntitlements && key != statusGroupReferences) // 'entitlements show' and 'why' have them
-                output.tree(key, value);
     return exitDone;
 }
 

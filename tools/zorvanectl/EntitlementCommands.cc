@@ -114,6 +114,33 @@ int showEntitlements(const zorvane::ConnectOptions& connect, const Output& outpu
     return exitDone;
 }
 
+int listEntitlements(const zorvane::ConnectOptions& connect, const Output& output) {
+    const auto registered = RegisteredEntitlements::ask(connect);
+    if (!registered)
+        return output.error(registered.error(), "list what is registered");
+    nlohmann::json list = nlohmann::json::array();
+    std::vector<std::vector<std::string>> rows;
+    for (const std::string& identifier : registered->identifiers()) {
+        using Kind = RegisteredEntitlements::GroupKind;
+        const std::size_t application = registered->groupsOf(identifier, Kind::application).size();
+        const std::size_t system = registered->groupsOf(identifier, Kind::system).size();
+        const bool systemContainer = registered->hasSystemContainer(identifier);
+        const auto children = registered->childrenOf(identifier);
+        list.push_back({{"identifier", identifier},
+                        {"applicationGroups", application},
+                        {"systemGroups", system},
+                        {"systemContainer", systemContainer},
+                        {"children", children}});
+        rows.push_back({std::to_string(application), std::to_string(system), systemContainer ? "yes" : "no",
+                        std::to_string(children.size()), printable(identifier)});
+    }
+    if (output.isJson())
+        output.json({{"identifiers", std::move(list)}});
+    else
+        output.table({"APP GROUPS", "SYSTEM GROUPS", "SYSTEM CONTAINER", "CHILDREN", "IDENTIFIER"}, rows);
+    return exitDone;
+}
+
 int clearEntitlements(const zorvane::ConnectOptions& connect, const Output& output, const std::string& identifier) {
     auto client = zorvane::Client::connect(connect);
     if (!client)

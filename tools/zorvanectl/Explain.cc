@@ -1,5 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // What a code means and what to do about it. Asks nobody: it works without a daemon.
+#include "Explain.h"
+
 #include "Commands.h"
 #include "check/Finding.h"
 #include "zorvane/Error.h"
@@ -45,7 +47,7 @@ int listPages(const Output& output, const std::vector<Page>& pages) {
         nlohmann::json list = nlohmann::json::array();
         for (const Page& page : pages)
             list.push_back(toJson(page));
-        output.json(list);
+        output.json({{"codes", std::move(list)}});
         return exitDone;
     }
     std::vector<std::vector<std::string>> rows;
@@ -56,6 +58,13 @@ int listPages(const Output& output, const std::vector<Page>& pages) {
 }
 
 } // namespace
+
+std::vector<std::pair<std::string, std::string>> explainedCodes() {
+    std::vector<std::pair<std::string, std::string>> codes;
+    for (const Page& page : allPages())
+        codes.emplace_back(page.name, page.meaning);
+    return codes;
+}
 
 int explain(const Output& output, const std::string& text) {
     const std::vector<Page> pages = allPages();

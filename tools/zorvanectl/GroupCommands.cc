@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Shared containers: where they are, who refers to them, and what would go with an identifier.
 #include "Commands.h"
+#include "KnownContainer.h"
 #include "RegisteredEntitlements.h"
 
 namespace zorvanectl {
@@ -29,9 +30,8 @@ struct GroupFate {
 };
 
 std::vector<GroupFate> fatesOf(const RegisteredEntitlements& registered, const std::string& identifier) {
-    using Kind = RegisteredEntitlements::GroupKind;
     std::vector<GroupFate> fates;
-    for (const auto& [kind, name] : {std::pair(Kind::application, "application"), std::pair(Kind::system, "system")})
+    for (const auto& [kind, name] : RegisteredEntitlements::groupKinds)
         for (auto& group : registered.groupsOf(identifier, kind)) {
             const bool goes = group.holders.size() == 1;
             fates.push_back({.group = std::move(group), .kind = name, .goes = goes});
@@ -126,6 +126,34 @@ int why(const zorvane::ConnectOptions& connect, const Output& output, const std:
     for (const std::string& child : registered->childrenOf(identifier))
         output.line("  and what goes with its child " + printable(child));
     return exitDone;
+}
+
+int whyGroup(const zorvane::ConnectOptions& connect, const Output& output, const std::string& identifier) {
+    const std::string what = "explain group " + identifier;
+    const auto registered = RegisteredEntitlements::ask(connect);
+    if (!registered)
+        return output.error(registered.error(), what);
+    for (const auto& [kind, name] : RegisteredEntitlements::groupKinds)
+        for (const RegisteredEntitlements::Group& group : registered->groups(kind)) {
+            if (group.identifier != identifier)
+                continue;
+            if (output.isJson()) {
+                output.json({{"group", identifier}, {"kind", name}, {"holders", group.holders}});
+                return exitDone;
+            }
+            output.line(printable(identifier) + ", " + name + " group, held by");
+            for (const std::string& holder : group.holders)
+                output.line("  " + printable(holder));
+            output.line(group.holders.size() == 1 ? "Its container goes when this one drops it."
+                                                  : "Its container goes when the last of these drops it.");
+            return exitDone;
+        }
+    return output.error({.kind = zorvane::Error::Kind::daemon,
+                         .code = codeNotFound,
+                         .message = "nobody is registered for this group",
+                         .advice = "'zorvanectl entitlements list' shows who is registered; a group comes with an "
+                                   "identifier that lists it"},
+                        what);
 }
 
 } // namespace zorvanectl

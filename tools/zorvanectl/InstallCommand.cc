@@ -12,6 +12,7 @@
 // where it does not say, nothing is thrown away.
 #include "Commands.h"
 #include "KnownContainer.h"
+#include "LostRecord.h"
 #include "ProgressDisplay.h"
 #include "content/ContainerDirectory.h"
 #include "content/Content.h"
@@ -76,7 +77,8 @@ private:
     int replace(Client& client);
     int settle(const zorvane::Error& error);
     int done(Client& client);
-    int failed(const std::string& message);
+    /// `advice`: what to do, where it is not to try again.
+    int failed(const std::string& message, const char* advice = "");
     /// What became of the transient container, for the end of a message.
     std::string discard();
 
@@ -87,21 +89,27 @@ private:
     const std::string what_;
     content::Source source_;
     std::optional<Client::Address> old_;
+    LostRecord lost_;
     Client::Address fresh_;
     std::string freshPath_;
     std::optional<std::uint64_t> bytesOut_ = 0;
     std::optional<std::uint64_t> bytesIn_ = 0;
     std::uint64_t items_ = 0;
+    bool isDone_ = false;
 };
 
 int Installation::run(Consent consent) {
     if (!canBeInstalled(target_.containerClass))
         return output_.localError(exitUsage, "only bundle and data containers get their content this way",
                                   "name another class", what_);
-    auto source = content::Source::open(options_.source);
+    const bool fromInput = options_.source == "-";
+    auto source = fromInput ? content::Source::ofStandardInput() : content::Source::open(options_.source);
     if (!source)
         return output_.localError(exitUsage, source.error().what,
-                                  "name an archive or a directory that its own owner, or root, has put there", what_);
+                                  fromInput
+                                      ? "have another program write an archive there, or name one"
+                                      : "name an archive or a directory that its own owner, or root, has put there",
+                                  what_);
     source_ = std::move(*source);
     auto client = Client::connect(connect_);
     if (!client)
@@ -111,12 +119,16 @@ int Installation::run(Consent consent) {
         return output_.error(old.error(), what_);
     if (old) {
         old_ = *old;
+        lost_ = lostRecordOf(*client, *old_);
+        if (const auto refused = refuseToLoseClass(connect_, output_, lost_, options_.keepClass, what_))
+            return *refused;
         bytesOut_ = measured(connect_, {&*old_, 1});
-        if (consent == Consent::ask && !output_.agreed(lossQuestion("Replace", bytesOut_, target_.identifier), what_))
+        if (consent == Consent::ask &&
+            !output_.agreed(lossQuestion("Replace", bytesOut_, target_.identifier, lostInfoText(lost_)), what_))
             return exitUsage;
     }
     const int exitCode = install(*client);
-    if (exitCode != exitDone) // what is done is not told as interrupted
+    if (!isDone_) // what is done is not told as interrupted
         endBySignal();
     return exitCode;
 }
@@ -152,7 +164,7 @@ int Installation::install(Client& client) {
         zor::platform::LinuxDisk disk;
         const auto filled = content::putContent(disk, container->get(), source_, observer, receivedSignal);
         if (!filled)
-            return failed(filled.error().what);
+            return failed(filled.error().what, filled.error().advice);
         items_ = filled->items;
     }
     // The daemon may have been started anew meanwhile.
@@ -202,8 +214,11 @@ int Installation::settle(const zorvane::Error& error) {
 }
 
 int Installation::done(Client& client) {
+    isDone_ = true;
     const auto metadata = client.metadata(fresh_);
     const std::string path = metadata ? metadata->path : "";
+    const bool kept = setClassAgain(client, output_, target_, lost_);
+    const int exitCode = kept || options_.keepClass == KeepClass::ifPossible ? exitDone : exitLocalError;
     if (output_.isJson()) {
         nlohmann::json json = {{"identifier", target_.identifier},
                                {"class", target_.containerClass},
@@ -213,20 +228,22 @@ int Installation::done(Client& client) {
                                {"bytesIn", toJson(bytesIn_)},
                                {"replaced", old_.has_value()}};
         json["bytesOut"] = toJson(bytesOut_);
-        output_.json(json);
-        return exitDone;
+        addLost(json, lost_, kept);
+        output_.json(std::move(json));
+        return exitCode;
     }
     output_.line(printable(target_.identifier) + " installed: " + shownBytes(bytesIn_) + " in " +
                  std::to_string(items_) + (items_ == 1 ? " item" : " items") + " came" +
-                 (old_ ? ", " + shownBytes(bytesOut_) + " went" : ""));
+                 (old_ ? ", " + shownBytes(bytesOut_) + " went" : "") +
+                 (lost_.infoKeys.empty() ? "" : ", and " + lostInfoText(lost_)));
     output_.line("  path  " + printable(path));
-    return exitDone;
+    return exitCode;
 }
 
-int Installation::failed(const std::string& message) {
+int Installation::failed(const std::string& message, const char* advice) {
     return output_.localError(exitLocalError, message + ". " + discard(),
-                              old_ ? "the old container is as it was; try again when the cause is gone"
-                                   : "try again when the cause is gone",
+                              (old_ ? "the old container is as it was; " : "") +
+                                  std::string(*advice == '\0' ? "try again when the cause is gone" : advice),
                               what_);
 }
 

@@ -50,8 +50,9 @@ std::optional<std::uint64_t> measured(const zorvane::ConnectOptions& connect,
 }
 
 std::string lossQuestion(const std::string& verb, const std::optional<std::uint64_t>& bytes,
-                         const std::string& identifier) {
-    return verb + " " + shownBytes(bytes) + " of " + printable(identifier) + "?";
+                         const std::string& identifier, const std::string& also) {
+    return verb + " " + shownBytes(bytes) + " of " + printable(identifier) + (also.empty() ? "" : ", with " + also) +
+           "?";
 }
 
 } // namespace zorvanectl

@@ -26,9 +26,9 @@ inline constexpr std::uint64_t codeNotFound = 21;
 [[nodiscard]] std::optional<std::uint64_t> measured(const zorvane::ConnectOptions& connect,
                                                     std::span<const zorvane::Client::Address> containers);
 
-/// Whether so much of an identifier's is to go for good.
+/// Whether so much of an identifier's is to go for good, and what else, where there is something.
 [[nodiscard]] std::string lossQuestion(const std::string& verb, const std::optional<std::uint64_t>& bytes,
-                                       const std::string& identifier);
+                                       const std::string& identifier, const std::string& also = {});
 
 /// Connects, finds the container, and does with it what is to be done.
 template <typename Body>

@@ -2,8 +2,7 @@
 // What is done with a container that is there: replacing, wiping, repairing, measuring it, and its info values.
 #include "Commands.h"
 #include "KnownContainer.h"
-
-#include <algorithm>
+#include "LostRecord.h"
 
 namespace zorvanectl {
 
@@ -40,25 +39,6 @@ int destroyed(const zorvane::Result<void>& result, const Output& output, const s
     return exitDone;
 }
 
-void printUsage(const Output& output, std::vector<std::pair<std::string, std::uint64_t>> rows) {
-    constexpr std::uint64_t barWidth = 40;
-    std::ranges::sort(rows, std::greater<>(), &std::pair<std::string, std::uint64_t>::second);
-    if (output.isJson()) {
-        nlohmann::json json = nlohmann::json::array();
-        for (const auto& [identifier, bytes] : rows)
-            json.push_back({{"identifier", identifier}, {"bytes", bytes}});
-        output.json(json);
-        return;
-    }
-    const std::uint64_t most = rows.empty() ? 0 : std::max<std::uint64_t>(rows.front().second, 1);
-    std::vector<std::vector<std::string>> table;
-    for (const auto& [identifier, bytes] : rows) {
-        const auto width = static_cast<double>(bytes) / static_cast<double>(most) * static_cast<double>(barWidth);
-        table.push_back({printable(identifier), shownBytes(bytes), std::string(static_cast<std::size_t>(width), '#')});
-    }
-    output.table({"IDENTIFIER", "SIZE", ""}, table);
-}
-
 } // namespace
 
 int replace(const zorvane::ConnectOptions& connect, const Output& output, const Target& target, Consent consent) {
@@ -82,14 +62,32 @@ int replace(const zorvane::ConnectOptions& connect, const Output& output, const 
                      "replaced", bytes);
 }
 
-int wipe(const zorvane::ConnectOptions& connect, const Output& output, const Target& target, Consent consent) {
+int wipe(const zorvane::ConnectOptions& connect, const Output& output, const Target& target, KeepClass keep,
+         Consent consent) {
     const std::string what = "wipe " + named(target);
     return withContainer(connect, output, target, what, [&](Client& client, const Client::Address& address) {
+        const LostRecord lost = lostRecordOf(client, address);
+        if (const auto refused = refuseToLoseClass(connect, output, lost, keep, what))
+            return *refused;
         const auto bytes = measured(connect, {&address, 1});
-        if (consent == Consent::ask && !output.agreed(lossQuestion("Wipe", bytes, target.identifier), what))
+        if (consent == Consent::ask &&
+            !output.agreed(lossQuestion("Wipe", bytes, target.identifier, lostInfoText(lost)), what))
             return exitUsage;
-        return destroyed(client.wipe(address.containerClass, address.user, address.identifier), output, what, target,
-                         "wiped", bytes);
+        if (const auto wiped = client.wipe(address.containerClass, address.user, address.identifier); !wiped)
+            return output.error(wiped.error(), what);
+        const bool kept = setClassAgain(client, output, target, lost);
+        if (output.isJson()) {
+            nlohmann::json document = {{"identifier", target.identifier},
+                                       {"class", target.containerClass},
+                                       {"wiped", true},
+                                       {"bytes", toJson(bytes)}};
+            addLost(document, lost, kept);
+            output.json(std::move(document));
+        } else {
+            output.line(printable(target.identifier) + " wiped, " + shownBytes(bytes) + " went" +
+                        (lost.infoKeys.empty() ? "" : ", and " + lostInfoText(lost)));
+        }
+        return kept || keep == KeepClass::ifPossible ? exitDone : exitLocalError;
     });
 }
 
@@ -141,37 +139,6 @@ int regenerate(const zorvane::ConnectOptions& connect, const Output& output, con
     });
 }
 
-int usage(const zorvane::ConnectOptions& connect, const Output& output, const Target& target) {
-    const std::string what = "measure " + std::string(zorvane::containerClassName(target.containerClass));
-    auto client = Client::connect(connect);
-    if (!client)
-        return output.error(client.error(), what);
-    const auto containers = client->list(target.containerClass, userOf(target), target.transient);
-    if (!containers)
-        return output.error(containers.error(), what);
-    std::vector<std::pair<std::string, std::uint64_t>> rows;
-    for (const auto& container : *containers) {
-        if (!target.identifier.empty() && container.identifier != target.identifier)
-            continue;
-        const auto bytes = client->diskUsage({.containerClass = target.containerClass,
-                                              .user = userOf(target),
-                                              .identifier = container.identifier,
-                                              .uuid = container.uuid});
-        // One that has gone since it was listed is no longer there to be measured.
-        if (!bytes && bytes.error().code != codeNotFound)
-            return output.error(bytes.error(), what);
-        if (bytes)
-            rows.emplace_back(container.identifier, *bytes);
-    }
-    if (rows.empty() && !target.identifier.empty())
-        return output.error({.kind = zorvane::Error::Kind::daemon,
-                             .code = codeNotFound,
-                             .message = "there is no container of this identifier"},
-                            "measure " + named(target));
-    printUsage(output, std::move(rows));
-    return exitDone;
-}
-
 int infoList(const zorvane::ConnectOptions& connect, const Output& output, const Target& target) {
     const std::string what = "list the info of " + named(target);
     return withContainer(connect, output, target, what, [&](Client& client, const Client::Address& address) {
@@ -179,7 +146,7 @@ int infoList(const zorvane::ConnectOptions& connect, const Output& output, const
         if (!found)
             return output.error(found.error(), what);
         if (output.isJson()) {
-            output.json(toJson({found->info}));
+            output.json({{"identifier", address.identifier}, {"info", toJson({found->info})}});
             return exitDone;
         }
         for (const auto& [key, value] : found->info)
@@ -196,7 +163,7 @@ int infoGet(const zorvane::ConnectOptions& connect, const Output& output, const 
         if (!value)
             return output.error(value.error(), what);
         if (output.isJson())
-            output.json(toJson(*value));
+            output.json({{"identifier", address.identifier}, {"key", key}, {"value", toJson(*value)}});
         else
             output.tree(key, *value);
         return exitDone;

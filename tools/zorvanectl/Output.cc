@@ -2,7 +2,11 @@
 #include "Output.h"
 
 #include <algorithm>
+#include <cerrno>
 #include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <cwchar>
 #include <iterator>
 #include <unistd.h>
 
@@ -33,8 +37,10 @@ const char* kindName(zorvane::Error::Kind kind) {
     return "unknown";
 }
 
-const char* adviceFor(const zorvane::Error& error) {
+std::string adviceFor(const zorvane::Error& error) {
     using Kind = zorvane::Error::Kind;
+    if (!error.advice.empty())
+        return error.advice;
     switch (error.kind) {
     case Kind::unreachable:
         return "start the daemon (systemctl start zorvaned), or name its root with --root";
@@ -51,13 +57,49 @@ const char* adviceFor(const zorvane::Error& error) {
     return "";
 }
 
+/// The daemon's codes for what is not there: a container, an info key.
+constexpr std::uint64_t codesNotFound[] = {21, 24};
+
 int exitCodeOf(const zorvane::Error& error) {
-    return error.kind == zorvane::Error::Kind::daemon ? exitDaemonError : exitUnreachable;
+    using Kind = zorvane::Error::Kind;
+    switch (error.kind) {
+    case Kind::unreachable:
+        return exitUnreachable;
+    case Kind::refused:
+        return exitRefused;
+    case Kind::timedOut:
+        return exitTimedOut;
+    case Kind::protocol:
+        break;
+    case Kind::daemon:
+        if (std::ranges::find(codesNotFound, error.code) != std::end(codesNotFound))
+            return exitNotFound;
+    }
+    return exitDaemonError;
+}
+
+/// Colours are for people's terminals, and only where they want them.
+bool isColoured(int descriptor) {
+    const char* unwanted = std::getenv("NO_COLOR");
+    const char* terminal = std::getenv("TERM");
+    return (!unwanted || *unwanted == '\0') && terminal && std::strcmp(terminal, "dumb") != 0 &&
+           ::isatty(descriptor) != 0;
+}
+
+constexpr const char* underlined = "\033[4m";
+constexpr const char* boldRed = "\033[1;31m";
+constexpr const char* plain = "\033[0m";
+
+std::string padded(const std::string& text, std::size_t columns) {
+    const std::size_t taken = columnsOf(text);
+    return text + std::string(columns > taken ? columns - taken : 0, ' ');
 }
 
 std::string shown(const zorvane::Value& value) {
+    // A string that reads like another kind of value is told apart from it: as an entitlement it grants nothing.
     if (const auto* text = std::get_if<std::string>(&value.content))
-        return printable(*text);
+        return *text == "yes" || *text == "no" || *text == "true" || *text == "false" ? "the string \"" + *text + "\""
+                                                                                      : printable(*text);
     if (const auto* boolean = std::get_if<bool>(&value.content))
         return *boolean ? "yes" : "no";
     return dumped(toJson(value), -1);
@@ -78,7 +120,8 @@ std::string onOneLine(const zorvane::Map& map) {
 
 } // namespace
 
-void Output::json(const nlohmann::json& document) const {
+void Output::json(nlohmann::json document) const {
+    document["version"] = jsonVersion;
     std::printf("%s\n", dumped(document).c_str());
 }
 
@@ -86,21 +129,26 @@ void Output::line(const std::string& text) const {
     std::printf("%s\n", text.c_str());
 }
 
+void Output::remark(const std::string& text) const {
+    std::fprintf(stderr, "zorvanectl: %s\n", printable(text).c_str());
+}
+
 void Output::table(const std::vector<std::string>& header, const std::vector<std::vector<std::string>>& rows) const {
     std::vector<std::size_t> widths;
     for (std::size_t column = 0; column < header.size(); ++column) {
-        widths.push_back(header[column].size());
+        widths.push_back(columnsOf(header[column]));
         for (const auto& row : rows)
-            widths.back() = std::max(widths.back(), row[column].size());
+            widths.back() = std::max(widths.back(), columnsOf(row[column]));
     }
-    const auto print = [&](const std::vector<std::string>& row) {
+    const auto textOf = [&](const std::vector<std::string>& row) {
+        std::string text;
         for (std::size_t column = 0; column + 1 < row.size(); ++column)
-            std::printf("%-*s  ", static_cast<int>(widths[column]), row[column].c_str());
-        std::printf("%s\n", row.back().c_str());
+            text += padded(row[column], widths[column]) + "  ";
+        return text + row.back();
     };
-    print(header);
+    line(isColoured(STDOUT_FILENO) ? underlined + textOf(header) + plain : textOf(header));
     for (const auto& row : rows)
-        print(row);
+        line(textOf(row));
 }
 
 void Output::tree(const std::string& name, const zorvane::Value& value, const std::string& indent) const {
@@ -130,37 +178,59 @@ bool Output::agreed(const std::string& question, const std::string& while_) cons
     return answer == 'y' || answer == 'Y';
 }
 
-int Output::error(const zorvane::Error& error, const std::string& while_) const {
-    const int exitCode = exitCodeOf(error);
+int Output::sayError(int exitCode, const std::string& message, const std::string& advice, const std::string& while_,
+                     nlohmann::json details) const {
     if (isJson()) {
-        nlohmann::json document = {{"error",
-                                    {{"kind", kindName(error.kind)},
-                                     {"message", error.message},
-                                     {"advice", adviceFor(error)},
-                                     {"while", while_}}}};
-        if (error.kind == zorvane::Error::Kind::daemon)
-            document["error"]["code"] = error.code;
-        std::fprintf(stderr, "%s\n", dumped(document).c_str());
+        details.update({{"message", message}, {"advice", advice}, {"while", while_}, {"exitCode", exitCode}});
+        std::fprintf(stderr, "%s\n", dumped({{"version", jsonVersion}, {"error", std::move(details)}}).c_str());
         return exitCode;
     }
-    const std::string code =
-        error.kind == zorvane::Error::Kind::daemon ? " (code " + std::to_string(error.code) + ")" : "";
-    std::fprintf(stderr, "zorvanectl: %s: %s%s\n  What to do: %s.\n", printable(while_).c_str(), error.message.c_str(),
-                 code.c_str(), adviceFor(error));
+    const auto code = details.find("code");
+    const std::string number = code == details.end() ? "" : " (code " + code->dump() + ")";
+    const bool coloured = isColoured(STDERR_FILENO);
+    std::fprintf(stderr, "zorvanectl: %s: %s%s%s%s\n  What to do: %s.\n", printable(while_).c_str(),
+                 coloured ? boldRed : "", message.c_str(), coloured ? plain : "", number.c_str(), advice.c_str());
     return exitCode;
+}
+
+int Output::error(const zorvane::Error& error, const std::string& while_) const {
+    nlohmann::json details = {{"kind", kindName(error.kind)}};
+    if (error.kind == zorvane::Error::Kind::daemon)
+        details["code"] = error.code;
+    return sayError(exitCodeOf(error), error.message, adviceFor(error), while_, std::move(details));
 }
 
 int Output::localError(int exitCode, const std::string& message, const std::string& advice,
                        const std::string& while_) const {
-    if (isJson()) {
-        const nlohmann::json document = {
-            {"error", {{"kind", "local"}, {"message", message}, {"advice", advice}, {"while", while_}}}};
-        std::fprintf(stderr, "%s\n", dumped(document).c_str());
-    } else {
-        std::fprintf(stderr, "zorvanectl: %s: %s\n  What to do: %s.\n", printable(while_).c_str(), message.c_str(),
-                     advice.c_str());
+    return sayError(exitCode, message, advice, while_, {{"kind", "local"}});
+}
+
+int Output::finished(int exitCode) const {
+    errno = 0;
+    const bool written = std::fflush(stdout) == 0 && std::ferror(stdout) == 0;
+    if (written)
+        return exitCode;
+    const char* reason = errno == 0 ? nullptr : ::strerrordesc_np(errno);
+    return localError(
+        exitOutputLost,
+        std::string("standard output cannot be written to") + (reason ? ": " : "") + (reason ? reason : ""),
+        "what was asked for was done, or failed, all the same; make room, or have the output go elsewhere, "
+        "and ask again with a command that only shows",
+        "write the result");
+}
+
+std::size_t columnsOf(const std::string& text) {
+    std::size_t columns = 0;
+    std::mbstate_t state{};
+    for (std::size_t at = 0; at < text.size();) {
+        wchar_t character = 0;
+        const std::size_t bytes = std::mbrtowc(&character, text.data() + at, text.size() - at, &state);
+        if (bytes == 0 || bytes > text.size() - at)
+            return text.size(); // a locale that knows no such characters
+        columns += static_cast<std::size_t>(std::max(::wcwidth(character), 0));
+        at += bytes;
     }
-    return exitCode;
+    return columns;
 }
 
 std::optional<zorvane::Value> fromJson(const nlohmann::json& json) {

@@ -59,17 +59,30 @@ std::vector<std::string> RegisteredEntitlements::childrenOf(const std::string& i
     return strings(in<zorvane::List>(in<zorvane::Map>(map(statusEntitlements), childrenKey), identifier));
 }
 
-std::vector<RegisteredEntitlements::Group> RegisteredEntitlements::groupsOf(const std::string& identifier,
-                                                                            GroupKind kind) const {
+std::vector<std::string> RegisteredEntitlements::identifiers() const {
+    std::vector<std::string> identifiers;
+    const zorvane::Map* entitlements = map(statusEntitlements);
+    for (const auto& [identifier, value] : entitlements ? *entitlements : zorvane::Map())
+        if (!identifier.starts_with(ownKeysBegin))
+            identifiers.push_back(identifier);
+    return identifiers;
+}
+
+std::vector<RegisteredEntitlements::Group> RegisteredEntitlements::groups(GroupKind kind) const {
     std::vector<Group> groups;
     const char* name = kind == GroupKind::application ? "Application" : "System";
     const zorvane::Map* references = in<zorvane::Map>(map(statusGroupReferences), name);
-    for (const auto& [group, value] : references ? *references : zorvane::Map()) {
-        auto holders = strings(std::get_if<zorvane::List>(&value.content));
-        if (std::ranges::find(holders, identifier) != holders.end())
-            groups.push_back({.identifier = group, .holders = std::move(holders)});
-    }
+    for (const auto& [group, value] : references ? *references : zorvane::Map())
+        groups.push_back({.identifier = group, .holders = strings(std::get_if<zorvane::List>(&value.content))});
     return groups;
+}
+
+std::vector<RegisteredEntitlements::Group> RegisteredEntitlements::groupsOf(const std::string& identifier,
+                                                                            GroupKind kind) const {
+    auto all = groups(kind);
+    std::erase_if(
+        all, [&](const Group& group) { return std::ranges::find(group.holders, identifier) == group.holders.end(); });
+    return all;
 }
 
 } // namespace zorvanectl

@@ -32,8 +32,10 @@ using Result = std::expected<T, Error>;
 struct ConnectOptions {
     /// The system root that the daemon works on.
     std::string root = "/";
-    /// For connecting, and for each call; 0 waits for ever.
-    std::uint32_t timeoutMilliseconds = 0;
+    /// For connecting, and for each call; 0 waits for ever. Not given: what the environment's
+    /// ZORVANE_TIMEOUT_MILLISECONDS says, else a minute, and for calls that walk a tree of files or wait for an unlock
+    /// (emptyDeathRow, wipe, replace, diskUsage, recreateDefaultStructure, setDataProtection) for ever.
+    std::optional<std::uint32_t> timeoutMilliseconds = {};
 };
 
 /// The user id in a request that stands for the current mobile user.

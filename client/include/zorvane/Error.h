@@ -10,10 +10,11 @@ namespace zorvane {
 
 struct Error {
     enum class Kind {
-        /// The daemon cannot be reached: not running, another root, no permission, or it stopped before the call.
+        /// The daemon cannot be reached: not running, another root, no permission; or it ended while the call waited,
+        /// and what the call was to change may have been done or not.
         unreachable,
-        /// The daemon ended the connection instead of answering: this program may not send the command, or the daemon
-        /// stopped while the call waited.
+        /// The daemon ended the connection instead of answering: it does not know this program, or does not do this for
+        /// it. The message says which, and whom it takes this program for.
         refused,
         /// The time given to the call ran out. The command may still be carried out.
         timedOut,
@@ -28,6 +29,8 @@ struct Error {
     std::uint64_t code = 0;
     /// One sentence for people, without a full stop.
     std::string message;
+    /// What to do, in the same form; empty where kind and code say it all (errorText).
+    std::string advice = {};
 };
 
 /// What a code of the daemon means, how it comes about, what follows from it, and what to do. Static strings, never

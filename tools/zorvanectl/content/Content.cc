@@ -16,6 +16,7 @@
 #include <optional>
 #include <sys/stat.h>
 #include <unistd.h>
+#include <vector>
 
 namespace zorvanectl::content {
 
@@ -30,9 +31,9 @@ Outcome<void> checkTarEnd(int archive, std::uint64_t bytes) {
     std::array<char, tarBlockBytes> block{};
     if (bytes < block.size() || ::pread(archive, block.data(), block.size(),
                                         static_cast<off_t>(bytes - block.size())) != static_cast<ssize_t>(block.size()))
-        return failed("the archive's end cannot be read");
+        return refused("the archive's end cannot be read");
     if (std::ranges::any_of(block, [](char byte) { return byte != 0; }))
-        return failed("the archive has no end: it was cut");
+        return refused("the archive has no end: it was cut");
     return {};
 }
 
@@ -71,13 +72,13 @@ public:
 private:
     int admit(const zor::fs::WalkEntry& entry, int item, const char* target) {
         if (entry.status.st_dev == container_.st_dev && entry.status.st_ino == container_.st_ino)
-            return answer(failed("the source holds the container itself"));
+            return answer(refused("the source holds the container itself"));
         const std::string name = entry.path();
         if (const auto why =
                 whyRefused({.name = name, .mode = entry.status.st_mode, .linkTarget = target ? target : ""}))
-            return answer(failed(refusal(name, *why)));
+            return answer(refused(refusal(name, *why)));
         if (const auto why = holders_.whyRefused(entry.depth, entry.status, item))
-            return answer(failed(refusal(name, *why)));
+            return answer(refused(refusal(name, *why)));
         if (S_ISDIR(entry.status.st_mode))
             holders_.enter(entry.depth, entry.status);
         return answer(course_.addItem());
@@ -95,7 +96,7 @@ private:
             return;
         const std::string name = entry.depth == 0 ? "the source" : zorvane::printable(entry.path());
         if (entry.onOtherFileSystem)
-            failure_ = Failure{.what = name + " lies on another file system than the source"};
+            failure_ = refused(name + " lies on another file system than the source").error();
         else
             failure_ = failed(name + " cannot be copied", -error).error();
     }
@@ -121,6 +122,42 @@ Outcome<Source> Source::open(const std::string& path) {
         return failed(zorvane::printable(path) + " is neither a directory nor a file");
     source.isDirectory_ = S_ISDIR(status.st_mode);
     source.bytes_ = static_cast<std::uint64_t>(status.st_size);
+    return source;
+}
+
+Outcome<Source> Source::ofStandardInput() {
+    constexpr const char* place = "/var/tmp";
+    constexpr mode_t mode = 0600;
+    if (::isatty(STDIN_FILENO) != 0)
+        return failed("standard input is a terminal, and no archive");
+    Source source;
+    source.file_.reset(::open(place, O_TMPFILE | O_RDWR | O_CLOEXEC, mode));
+    if (!source.file_.valid())
+        return failed(std::string("an archive from standard input cannot be kept in ") + place, errno);
+    std::vector<char> buffer(std::size_t{1} << 20);
+    for (;;) {
+        const ssize_t count = ::read(STDIN_FILENO, buffer.data(), buffer.size());
+        if (count < 0 && errno == EINTR)
+            continue;
+        if (count < 0)
+            return failed("standard input cannot be read", errno);
+        if (count == 0)
+            break;
+        for (ssize_t done = 0; done < count;) {
+            const ssize_t written =
+                ::write(source.file_.get(), buffer.data() + done, static_cast<std::size_t>(count - done));
+            if (written < 0 && errno == EINTR)
+                continue;
+            if (written <= 0)
+                return failed(std::string("an archive from standard input cannot be kept in ") + place, errno);
+            done += written;
+        }
+        source.bytes_ += static_cast<std::uint64_t>(count);
+    }
+    if (source.bytes_ == 0)
+        return failed("standard input is empty, and no archive");
+    if (::lseek(source.file_.get(), 0, SEEK_SET) != 0)
+        return failed("the archive cannot be read from its beginning", errno);
     return source;
 }
 

@@ -26,6 +26,9 @@ class Source {
 public:
     /// A path of the caller's own; openForInstallation says how far it is followed.
     [[nodiscard]] static Outcome<Source> open(const std::string& path);
+    /// An archive that comes in there, to its end. It is kept in a file without a name in /var/tmp meanwhile: archives
+    /// have their directory at the end, and are larger than memory.
+    [[nodiscard]] static Outcome<Source> ofStandardInput();
 
     [[nodiscard]] bool isDirectory() const { return isDirectory_; }
     [[nodiscard]] int get() const { return file_.get(); }

@@ -26,7 +26,7 @@ Course::Course(int place, const volatile std::sig_atomic_t& stop, Report report)
 
 Outcome<void> Course::addItem() {
     if (++progress_.items > itemsMax)
-        return failed("the source holds more than " + std::to_string(itemsMax) + " items");
+        return refused("the source holds more than " + std::to_string(itemsMax) + " items");
     if (progress_.items - itemsAtCheck_ >= itemsBetweenChecks)
         if (auto room = checkRoom(); !room)
             return room;
@@ -52,12 +52,12 @@ Outcome<void> Course::checkRoom() {
     const std::uint64_t available = status.f_bavail * unit;
     const std::uint64_t reserve = std::min(reserveBytesMax, status.f_blocks * unit / reserveShare);
     if (available < reserve)
-        return failed("the store's file system would be left with too little space");
+        return lacksRoom("the store's file system would be left with too little space");
     bytesAtNextCheck_ =
         progress_.bytes + std::clamp((available - reserve) / 2, bytesBetweenChecksMin, bytesBetweenChecksMax);
     // File systems that make inodes as they are needed say that there are none.
     if (status.f_files != 0 && status.f_favail < status.f_files / reserveShare)
-        return failed("the store's file system would be left with too few inodes");
+        return lacksRoom("the store's file system would be left with too few inodes");
     return {};
 }
 

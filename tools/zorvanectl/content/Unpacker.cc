@@ -30,7 +30,7 @@ std::string_view textOf(std::span<const std::uint8_t> bytes) {
 }
 
 std::unexpected<Failure> refused(std::string_view name, std::string_view reason) {
-    return failed(refusal(name, reason));
+    return content::refused(refusal(name, reason));
 }
 
 } // namespace
@@ -65,7 +65,7 @@ Outcome<std::uint32_t> Unpacker::unpack(int records) {
                 return record.flags;
             break;
         case RecordKind::failure:
-            return failed("the archive cannot be read: " + zorvane::printable(std::string(textOf(*bytes))));
+            return content::refused("the archive cannot be read: " + zorvane::printable(std::string(textOf(*bytes))));
         default:
             return failed("the archive's decoder sends nonsense");
         }
@@ -90,7 +90,8 @@ Outcome<void> Unpacker::fill(int records, std::size_t bytes) {
         if (count < 0)
             return failed("the archive's decoder cannot be read", errno);
         if (count == 0)
-            return failed("the archive's decoder ended too early: the archive asks for too much, or breaks it");
+            return content::refused(
+                "the archive's decoder ended too early: the archive asks for too much, or breaks it");
         end_ += static_cast<std::size_t>(count);
     }
     return {};
