@@ -91,6 +91,7 @@ void Daemon::setUp() {
     }
     if (!setup.stopped())
         client->containerManagerSetup();
+    setup.setSurroundings({});
 }
 
 void Daemon::followLockState() {

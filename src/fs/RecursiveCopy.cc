@@ -51,8 +51,10 @@ std::string linkKey(int file, const struct stat& status) {
 
 class Copier {
 public:
-    Copier(platform::Disk& disk, int toDirectory, const char* to)
-        : disk_(disk), attributes_(disk), data_(disk), toDirectory_(toDirectory), to_(to) {}
+    Copier(platform::Disk& disk, int toDirectory, const char* to, const std::function<bool()>& goOn)
+        : disk_(disk), attributes_(disk), data_(disk, goOn ? [goOn](std::uint64_t) { return goOn() ? 0 : -ECANCELED; }
+                                                           : std::function<int(std::uint64_t)>()),
+          toDirectory_(toDirectory), to_(to), goOn_(goOn) {}
     /// The copy of content, into `toDirectory` itself.
     Copier(platform::Disk& disk, int toDirectory, const ContentRules& rules)
         : disk_(disk), attributes_(disk), data_(disk, rules.copied), toDirectory_(toDirectory), to_("."),
@@ -82,6 +84,7 @@ private:
     CopyData data_;
     const int toDirectory_;
     const char* const to_;
+    const std::function<bool()> goOn_;
     /// nullptr: everything comes along.
     const ContentRules* const rules_ = nullptr;
     DirectoryStack destination_;
@@ -108,6 +111,8 @@ int Copier::copy(int fromDirectory, const char* from) {
 }
 
 int Copier::visit(const WalkEntry& entry) {
+    if (goOn_ && !goOn_())
+        return -ECANCELED;
     if (entry.onOtherFileSystem)
         return -EXDEV;
     const bool leaving = entry.kind == WalkEntryKind::directoryEnd;
@@ -304,8 +309,9 @@ int Copier::openLinks() {
 
 } // namespace
 
-int copyTree(platform::Disk& disk, int fromDirectory, const char* from, int toDirectory, const char* to) {
-    return Copier(disk, toDirectory, to).copy(fromDirectory, from);
+int copyTree(platform::Disk& disk, int fromDirectory, const char* from, int toDirectory, const char* to,
+             const std::function<bool()>& goOn) {
+    return Copier(disk, toDirectory, to, goOn).copy(fromDirectory, from);
 }
 
 int copyContent(platform::Disk& disk, int from, int to, const ContentRules& rules) {

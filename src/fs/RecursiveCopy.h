@@ -32,8 +32,10 @@
 
 namespace zor::fs {
 
-/// 0, or -errno. -EEXIST when the destination exists, -ENOENT when the source does not.
-int copyTree(platform::Disk& disk, int fromDirectory, const char* from, int toDirectory, const char* to);
+/// 0, or -errno. -EEXIST when the destination exists, -ENOENT when the source does not. `goOn` is asked often; with the
+/// answer false the copy ends with -ECANCELED.
+int copyTree(platform::Disk& disk, int fromDirectory, const char* from, int toDirectory, const char* to,
+             const std::function<bool()>& goOn = {});
 
 /// How the content of a directory is copied to become somebody's: whose, and what may come along.
 struct ContentRules {

@@ -85,6 +85,9 @@ public:
     Result<FileURL> createTemporaryDirectoryInDirectoryURL(const FileURL& directory);
 
     // Removal, copy, move.
+    /// Asked often by what may take long. After the answer false it ends with ECANCELED, as soon as what it leaves is
+    /// whole or hidden: the source of a copy stays, and what was copied is a leftover.
+    using GoOn = std::function<bool()>;
     /// Removes a tree; what is missing is not missed. An item that cannot be removed lets the rest go and is the error.
     /// An immutable or append-only item is made mutable and removed. Absent URL: EFAULT.
     Result<void> removeItemAtURL(const std::optional<FileURL>& url);
@@ -92,10 +95,11 @@ public:
     Result<void> removeItemIn(int directory, const FileURL& url);
     Result<void> copyItemAtURL(const FileURL& source, const FileURL& destination);
     Result<void> copyItemIfExistsAtURL(const FileURL& source, const FileURL& destination);
-    Result<void> moveItemAtURL(const FileURL& source, const FileURL& destination);
+    Result<void> moveItemAtURL(const FileURL& source, const FileURL& destination, const GoOn& goOn = {});
     /// The same from and to directories that are open: it needs no descriptor then, unless it has to copy.
     enum class Moved { byName, byCopy };
-    Result<Moved> moveItem(int fromDirectory, const FileURL& source, int toDirectory, const FileURL& destination);
+    Result<Moved> moveItem(int fromDirectory, const FileURL& source, int toDirectory, const FileURL& destination,
+                           const GoOn& goOn = {});
     /// The same by name alone: to another file system it fails with EXDEV.
     Result<void> renameItem(int fromDirectory, const FileURL& source, int toDirectory, const FileURL& destination);
     Result<void> moveItemIfExistsAtURL(const FileURL& source, const FileURL& destination);
@@ -107,7 +111,8 @@ public:
     /// Gives everything that belonged to `formerOwner` to the new one, but metadata files and files with a name outside
     /// the tree; that and what is the new one's becomes 0755, for directories and what has an execute bit, else 0644.
     /// Anybody else's keeps owner and mode, and is said.
-    Result<void> standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid, uid_t formerOwner);
+    Result<void> standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid, uid_t formerOwner,
+                                           const GoOn& goOn = {});
     /// The entries whose names do not begin with ".", in the directory's order. ENOKEY where an encryption hides them.
     Result<std::vector<FileURL>> urlsForItemsInDirectoryAtURL(const FileURL& directory);
     /// The same, each to the visitor as it is read, so that no directory is too large for the memory; with a false
@@ -163,14 +168,16 @@ public:
 private:
     enum class MissingSource { fails, isFine };
     Result<void> _copyItemAtURL(const FileURL& source, const FileURL& destination, MissingSource missing);
-    Result<void> _moveItemAtURL(const FileURL& source, const FileURL& destination, MissingSource missing);
+    Result<void> _moveItemAtURL(const FileURL& source, const FileURL& destination, MissingSource missing,
+                                const GoOn& goOn);
     Result<void> moveAcrossFileSystems(int fromDirectory, const FileURL& source, int toDirectory,
-                                       const FileURL& destination);
+                                       const FileURL& destination, const GoOn& goOn);
     /// 0 or a negative errno: the source then has its name still, or is a hidden leftover.
     int removeMovedSource(int fromDirectory, const FileURL& source, int toDirectory);
     Result<bool> sourceIsMissing(const FileURL& source);
     /// Copies beside the destination and renames, so that a partial copy never has the final name.
-    Result<void> copyTree(int fromDirectory, const FileURL& source, int toDirectory, const FileURL& destination);
+    Result<void> copyTree(int fromDirectory, const FileURL& source, int toDirectory, const FileURL& destination,
+                          const GoOn& goOn);
 
     std::vector<FileURL> itemsNamed(const FileURL& directory, bool (*belongs)(std::string_view name)) const;
 

@@ -108,12 +108,12 @@ Result<void> ZORFileManager::copyItemIfExistsAtURL(const FileURL& source, const 
     return _copyItemAtURL(source, destination, MissingSource::isFine);
 }
 
-Result<void> ZORFileManager::moveItemAtURL(const FileURL& source, const FileURL& destination) {
-    return _moveItemAtURL(source, destination, MissingSource::fails);
+Result<void> ZORFileManager::moveItemAtURL(const FileURL& source, const FileURL& destination, const GoOn& goOn) {
+    return _moveItemAtURL(source, destination, MissingSource::fails, goOn);
 }
 
 Result<void> ZORFileManager::moveItemIfExistsAtURL(const FileURL& source, const FileURL& destination) {
-    return _moveItemAtURL(source, destination, MissingSource::isFine);
+    return _moveItemAtURL(source, destination, MissingSource::isFine, {});
 }
 
 Result<bool> ZORFileManager::sourceIsMissing(const FileURL& source) {
@@ -136,14 +136,17 @@ Result<void> ZORFileManager::_copyItemAtURL(const FileURL& source, const FileURL
         return posixError({"copyTree", __LINE__}, number, "clonetree of %s to %s failed: %s", source.c_str(),
                           destination.c_str(), errorText(number));
     }
-    return copyTree(from->directory.get(), source, to->directory.get(), destination);
+    return copyTree(from->directory.get(), source, to->directory.get(), destination, {});
 }
 
 Result<void> ZORFileManager::copyTree(int fromDirectory, const FileURL& source, int toDirectory,
-                                      const FileURL& destination) {
+                                      const FileURL& destination, const GoOn& goOn) {
     const std::string hidden = fs::uniqueName(fs::copyPrefix);
     int status = fs::copyTree(disk_, fromDirectory, std::string(source.lastPathComponent()).c_str(), toDirectory,
-                              hidden.c_str());
+                              hidden.c_str(), goOn);
+    if (status == -ECANCELED) // who is to end does not stay to tidy up
+        return posixError(ZOR_HERE, ECANCELED, "clonetree of %s to %s was stopped", source.c_str(),
+                          destination.c_str());
     // Nothing of a copy may be missing once it has its name, whatever the power does.
     if (status == 0) {
         const auto copied = platform::openBeneath(toDirectory, ".", O_RDONLY | O_DIRECTORY);
@@ -160,7 +163,8 @@ Result<void> ZORFileManager::copyTree(int fromDirectory, const FileURL& source, 
     return {};
 }
 
-Result<void> ZORFileManager::_moveItemAtURL(const FileURL& source, const FileURL& destination, MissingSource missing) {
+Result<void> ZORFileManager::_moveItemAtURL(const FileURL& source, const FileURL& destination, MissingSource missing,
+                                            const GoOn& goOn) {
     if (missing == MissingSource::isFine && TRY(sourceIsMissing(source)))
         return {};
     const auto from = resolver_.openParent(source);
@@ -168,18 +172,18 @@ Result<void> ZORFileManager::_moveItemAtURL(const FileURL& source, const FileURL
     if (!from || !to)
         return posixError(ZOR_HERE, from ? to.error() : from.error(), "rename of %s to %s failed: %s", source.c_str(),
                           destination.c_str(), errorText(from ? to.error() : from.error()));
-    TRY(moveItem(from->directory.get(), source, to->directory.get(), destination));
+    TRY(moveItem(from->directory.get(), source, to->directory.get(), destination, goOn));
     return {};
 }
 
 Result<ZORFileManager::Moved> ZORFileManager::moveItem(int fromDirectory, const FileURL& source, int toDirectory,
-                                                       const FileURL& destination) {
+                                                       const FileURL& destination, const GoOn& goOn) {
     auto renamed = renameItem(fromDirectory, source, toDirectory, destination);
     if (renamed)
         return Moved::byName;
     if (!renamed.error().isPosix(EXDEV))
         return std::move(renamed).error();
-    TRY(moveAcrossFileSystems(fromDirectory, source, toDirectory, destination));
+    TRY(moveAcrossFileSystems(fromDirectory, source, toDirectory, destination, goOn));
     return Moved::byCopy;
 }
 
@@ -194,8 +198,8 @@ Result<void> ZORFileManager::renameItem(int fromDirectory, const FileURL& source
 }
 
 Result<void> ZORFileManager::moveAcrossFileSystems(int fromDirectory, const FileURL& source, int toDirectory,
-                                                   const FileURL& destination) {
-    TRY(copyTree(fromDirectory, source, toDirectory, destination));
+                                                   const FileURL& destination, const GoOn& goOn) {
+    TRY(copyTree(fromDirectory, source, toDirectory, destination, goOn));
     const int removed = removeMovedSource(fromDirectory, source, toDirectory);
     if (removed < 0)
         log_.write(logLevelError, __func__, "Failed to remove source %s : %s", source.c_str(), errorText(-removed));
@@ -291,11 +295,15 @@ void ZORFileManager::standardizeEntry(int parent, const char* name, int director
         log_.write(logLevelError, function, "Could not chmod %s: %s", ZOR_SHOWN(path), errorText(-changed));
 }
 
-Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid, uid_t formerOwner) {
+Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid, uid_t formerOwner,
+                                                       const GoOn& goOn) {
     Standard standard{.uid = uid, .gid = gid, .formerOwner = formerOwner};
     const bool rootIsMetadata = url.path().find(names::metadataFile) != std::string::npos;
     fs::NamesMet namesMet;
     Result<void> walked = _traverseDirectory(url, [&](const WalkEntry& entry) -> Result<void> {
+        if (goOn && !goOn())
+            return posixError({"standardizeOwnershipAtURL", __LINE__}, ECANCELED,
+                              "The change of owners below %s was stopped", url.c_str());
         const std::string path = below(url, entry.path());
         if (entry.kind != WalkEntryKind::directoryEnd && !entry.onOtherFileSystem &&
             path.find(names::metadataFile) == std::string::npos)

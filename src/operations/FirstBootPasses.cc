@@ -60,6 +60,10 @@ std::uint64_t ZOREntitlementMapping::migrateAppGroupIdsFromDataContainersToFile(
     int errors = 0;
     std::uint64_t migrated = 0;
     for (const auto& container : containers) {
+        if (!services_.setup.goOn()) {
+            ++errors; // no marker
+            break;
+        }
         if (!groupIdentifiersIn(*container) || entitlementMapKeys::isOne(container->identifier()))
             continue;
         if (migrateGroupIdentifiers(*container))
@@ -149,6 +153,8 @@ std::uint64_t ZOREntitlementMapping::reconcileSystemContainers() {
     }
     std::uint64_t removed = 0;
     for (const auto& container : *containers) {
+        if (!services_.setup.goOn())
+            break;
         const std::string& identifier = container->identifier();
         if (owners->contains(identifier))
             continue;

@@ -87,6 +87,9 @@ const State* stateOf(ZORFileManager& fileManager, const ReplaceJournal& journal)
 } // namespace
 
 Result<void> ZORClientConnection::_recoverFromReplaceOperationsWithError() {
+    // Until all of them have been looked at, whoever asks for what one may name lists them again: want of memory, or a
+    // stop, may end this anywhere.
+    services_.waitingReplaces.setUnlisted(true);
     const FileURL replace = services_.configuration.replaceDirectory();
     const auto items = services_.fileManager.urlsForItemsInDirectoryAtURL(replace);
     if (!items) {
@@ -96,13 +99,14 @@ Result<void> ZORClientConnection::_recoverFromReplaceOperationsWithError() {
         services_.waitingReplaces.setUnlisted(!items.error().isPosix(ENOENT));
         return {};
     }
-    services_.waitingReplaces.setUnlisted(false);
     // A journal has its name for itself alone, so no later write removes what a stop left of this one's.
     for (const FileURL& leftover : services_.fileManager.writeLeftoversInDirectoryAtURL(replace))
         (void)_moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
     std::optional<ZORError> unread;
     std::optional<ZORError> stopped;
     for (const FileURL& item : *items) {
+        if (!services_.setup.goOn())
+            return {};
         auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(services_.log, services_.fileManager, item);
         // It stays, with what it names in staging; the others do not hang on it.
         const bool unreadable = !journal && ReplaceJournal::mayStillBeRead(journal.error());
@@ -117,6 +121,7 @@ Result<void> ZORClientConnection::_recoverFromReplaceOperationsWithError() {
                                            .oldUrl = journal ? journal->oldUrl : FileURL(),
                                            .destUrl = journal ? journal->destUrl : FileURL()});
     }
+    services_.waitingReplaces.setUnlisted(false);
     if (stopped)
         return std::move(*stopped);
     return unread ? Result<void>(std::move(*unread)) : Result<void>();
@@ -165,7 +170,8 @@ Result<void> ZORClientConnection::applyReplaceJournal(const ReplaceJournal& jour
             const auto from =
                 TRY(fileManager.openDirectoryOf(ownerUnchanged, journal.stagingUrl.deletingLastPathComponent()));
             const auto to = TRY(fileManager.openDirectoryOf(*owner, place));
-            TRY(fileManager.moveItem(from.get(), journal.stagingUrl, to.get(), journal.oldUrl));
+            TRY(fileManager.moveItem(from.get(), journal.stagingUrl, to.get(), journal.oldUrl,
+                                     services_.setup.check()));
             return {};
         }();
         if (!moved)

@@ -104,7 +104,7 @@ ZORContainerMigrator::Outcome ZORContainerMigrator::performMigrationWithError() 
     log.write(logLevelNotice, migrationFunction, "Changing ownership of bundle container content. %llu errors so far",
               static_cast<unsigned long long>(count.errors));
     auto owned = services_.fileManager.standardizeOwnershipAtURL(bundles, bundleOwnerUserId, bundleOwnerUserId,
-                                                                 firstMobileUserId);
+                                                                 firstMobileUserId, services_.setup.check());
     if (owned)
         if (const int failure = orderBeforeMarker(bundles); failure < 0)
             owned = posixError({migrationFunction, __LINE__}, -failure, "sync of %s failed: %s", bundles.c_str(),
@@ -164,7 +164,7 @@ Result<void> ZORContainerMigrator::moveFormerBundles(const FileURL& former, cons
     // what would come along is not all of the old owner's.
     if (!present.empty() || holdsOfOthers(former))
         return moveEachFormerBundle(former);
-    return services_.fileManager.moveItemAtURL(former, bundles);
+    return services_.fileManager.moveItemAtURL(former, bundles, services_.setup.check());
 }
 
 bool ZORContainerMigrator::isOfAnother(const FileURL& directory) {
@@ -201,7 +201,9 @@ Result<void> ZORContainerMigrator::moveEachFormerBundle(const FileURL& former) {
         const auto target =
             services_.configuration.containerDirectoryURLForUser(bundleOwnerUserId, containerClass, false);
         for (const FileURL& container : *containers)
-            if (isOfAnother(container))
+            if (!services_.setup.goOn())
+                return posixError({migrationFunction, __LINE__}, ECANCELED, "The daemon was told to end");
+            else if (isOfAnother(container))
                 continue;
             else if (auto moved =
                          moveFormerBundle(container, target->appendingDirectory(container.lastPathComponent()));
@@ -236,7 +238,7 @@ Result<void> ZORContainerMigrator::moveFormerBundle(const FileURL& container, co
         to = fileManager.openDirectoryOf(bundleOwnerUserId, place);
     if (!to)
         return std::move(to).error();
-    TRY(fileManager.moveItem(from->directory.get(), container, to->get(), target));
+    TRY(fileManager.moveItem(from->directory.get(), container, to->get(), target, services_.setup.check()));
     return {};
 }
 
@@ -257,6 +259,10 @@ void ZORContainerMigrator::adoptBundlesOfClass(ContainerClass containerClass, Co
         return;
     }
     for (const FileURL& container : *containers) {
+        if (!services_.setup.goOn()) {
+            ++count.unfinished;
+            return;
+        }
         if (auto adopted = adoptBundle(container); adopted) {
             ++count.migrated;
         } else {
@@ -329,6 +335,8 @@ bool ZORContainerMigrator::migrateWellknownOfClass(ContainerClass containerClass
         return false;
     }
     for (const auto& record : *records) {
+        if (!services_.setup.goOn())
+            return false;
         auto migrated = migrateWellknown(record, containerClass, *classDirectory);
         if (!migrated) {
             outcome.succeeded = false;

@@ -131,6 +131,8 @@ std::uint64_t ZORGroupManager::_cleanupUnreferencedGroupContainersForUser(std::u
     }
     std::uint64_t removed = 0;
     for (const auto& record : *records) {
+        if (!services_.setup.goOn())
+            break;
         if (references.contains(record->identifier()))
             continue;
         log_.write(logLevelError, __func__, "Removing group container with identifier %s for %u",

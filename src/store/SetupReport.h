@@ -35,8 +35,11 @@ public:
 
     void setSurroundings(Surroundings surroundings) { surroundings_ = std::move(surroundings); }
 
-    /// Between two items: false when the rest is to be left for the next launch.
+    /// Between two items: false when the rest is to be left for the next launch. Once the surroundings have been taken
+    /// away, from any thread.
     bool goOn() {
+        if (!surroundings_.progress && !surroundings_.stopWanted)
+            return !stopped_;
         const auto now = std::chrono::steady_clock::now();
         if (surroundings_.progress && now - progressSaid_ >= progressPeriod) {
             progressSaid_ = now;
@@ -46,6 +49,10 @@ public:
         return !stopped_;
     }
     [[nodiscard]] bool stopped() const { return stopped_; }
+    /// The same, for work that takes a function.
+    [[nodiscard]] std::function<bool()> check() {
+        return [this] { return goOn(); };
+    }
 
     /// Runs `pass`, which gives the number of items that it changed, and notes it under `name` (a literal). Not when
     /// the setup is to stop. An exception ends this pass alone.

@@ -1,10 +1,12 @@
 // SPDX-License-Identifier: Apache-2.0
 // What the first launch of a boot makes of an older system: its bundles, well-known containers, group identifiers, and
 // system containers that nobody is entitled to.
+#include "daemon/Daemon.h"
 #include "world/World.h"
 
 #include <algorithm>
 #include <gtest/gtest.h>
+#include <optional>
 #include <stdexcept>
 #include <unistd.h>
 
@@ -44,6 +46,47 @@ ZORContainerMigrator::Outcome migrateBundles(World& world) {
     world.load();
     world.log.take();
     return world.services().store().migrator.performMigrationWithError();
+}
+
+// Goal: a stop during a first boot ends it at the next item, wherever it comes, and loses nothing. Method: bundles with
+// many files, on the system's file system or on another one; a stop at each look at whether there is one, each launch
+// going on where the one before it was stopped; changes of the disk behind the stop are counted.
+TEST(Migration, StopsAtTheNextItem) {
+    for (const bool mounted : {false, true}) {
+        SCOPED_TRACE(mounted);
+        if (mounted && !MountedHome::canBe())
+            GTEST_SKIP() << "only root may mount a home";
+        World world;
+        std::optional<MountedHome> home;
+        if (mounted)
+            home.emplace(world.path());
+        for (const std::string& uuid : {firstUuid, secondUuid, thirdUuid}) {
+            putFormerBundle(world, former + "/Application/" + uuid, "app" + uuid);
+            for (int i = 0; i < 10; ++i)
+                world.write(former + "/Application/" + uuid + "/" + std::to_string(i), "x");
+        }
+        int stops = 0;
+        for (int allowed = 0; !world.bootMarker.state.present; ++allowed) {
+            int looks = 0;
+            int behind = 0;
+            world.restart();
+            world.disk().arm({.filter = [&](const support::DiskCallInfo&) {
+                behind += looks > allowed ? 1 : 0;
+                return false;
+            }});
+            Daemon(world.services(), {.stopWanted = [&] { return looks++ >= allowed; }}).setUp();
+            world.disk().disarm();
+            world.drainDeathRow();
+            ASSERT_LT(behind, 12) << "after look " << allowed;
+            stops += looks > allowed ? 1 : 0;
+            ASSERT_LT(stops, 1000);
+        }
+        EXPECT_GT(stops, mounted ? 60 : 30);
+        for (const std::string& uuid : {firstUuid, secondUuid, thirdUuid})
+            for (int i = 0; i < 10; ++i)
+                EXPECT_EQ(world.read(bundles + "/Application/" + uuid + "/" + std::to_string(i)), "x");
+        EXPECT_TRUE(world.exists(bundleMarker));
+    }
 }
 
 // Goal: an older system's bundles become the installer's, once; what cannot be read stays and is counted.
