@@ -45,6 +45,7 @@ public:
     int sync(int) override { return -EROFS; }
     int syncFileSystem(int) override { return -EROFS; }
     int orderData(int) override { return -EROFS; }
+    [[nodiscard]] ssize_t read(int fd, std::span<std::uint8_t> bytes) override { return platform::readOnce(fd, bytes); }
     [[nodiscard]] bool hidesNames(int directory) override { return platform::hidesNames(directory); }
 };
 

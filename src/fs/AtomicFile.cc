@@ -99,8 +99,8 @@ int judge(const struct stat& status, std::size_t bytesMax, std::optional<uid_t> 
 
 } // namespace
 
-std::expected<plist::Data, int> readOwnedFile(int directory, const char* path, std::size_t bytesMax,
-                                              std::optional<uid_t> formerOwner) {
+std::expected<plist::Data, int> readOwnedFile(platform::Disk& disk, int directory, const char* path,
+                                              std::size_t bytesMax, std::optional<uid_t> formerOwner) {
     const auto file = platform::openBeneathOnMount(directory, path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
     if (!file)
         return std::unexpected(file.error());
@@ -113,11 +113,9 @@ std::expected<plist::Data, int> readOwnedFile(int directory, const char* path, s
     plist::Data bytes(static_cast<std::size_t>(status.st_size));
     std::size_t length = 0;
     while (length < bytes.size()) {
-        const ssize_t count = ::read(file->get(), bytes.data() + length, bytes.size() - length);
-        if (count < 0 && errno == EINTR)
-            continue;
+        const ssize_t count = disk.read(file->get(), std::span(bytes).subspan(length));
         if (count < 0)
-            return std::unexpected(errno);
+            return std::unexpected(static_cast<int>(-count));
         if (count == 0)
             break;
         length += static_cast<std::size_t>(count);

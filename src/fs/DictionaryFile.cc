@@ -35,8 +35,9 @@ Result<void> writeToURL(const plist::Dictionary& dictionary, const FileURL& url,
 
 Result<plist::Dictionary> readDictionaryAtURL(const FileURL& url, std::size_t bytesMax, ZORFileManager& fileManager) {
     const auto parent = fileManager.resolver().openParent(url);
-    const auto bytes = parent ? fs::readOwnedFile(parent->directory.get(), parent->name.c_str(), bytesMax)
-                              : std::unexpected(parent.error());
+    const auto bytes =
+        parent ? fs::readOwnedFile(fileManager.disk(), parent->directory.get(), parent->name.c_str(), bytesMax)
+               : std::unexpected(parent.error());
     if (!bytes)
         return posixError(ZOR_HERE, bytes.error(), "read of %s failed: %s", url.c_str(), errorText(bytes.error()));
     auto value = plist::readPropertyList(*bytes);

@@ -29,8 +29,8 @@ bool ZORClientConnection::mayComeBack(const FileURL& staged, const WaitingReplac
     const auto parent = resolver.openParent(staged);
     const int failure = parent ? 0 : parent.error();
     const auto bytes =
-        parent ? fs::readOwnedFile(parent->directory.get(), (parent->name + "/" + names::metadataFile).c_str(),
-                                   fs::metadataFileBytesMax)
+        parent ? fs::readOwnedFile(services_.fileManager.disk(), parent->directory.get(),
+                                   (parent->name + "/" + names::metadataFile).c_str(), fs::metadataFileBytesMax)
                : std::unexpected(failure);
     if (bytes) {
         const auto record = parseMetadata(*bytes, ContainerPlace(staged), atStake.userId, CheckClassPath::no);

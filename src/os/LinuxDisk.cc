@@ -152,6 +152,10 @@ int LinuxDisk::orderData(int fd) {
     return result == -ENOSYS ? checked([&] { return ::fdatasync(fd); }) : result;
 }
 
+ssize_t LinuxDisk::read(int fd, std::span<std::uint8_t> bytes) {
+    return readOnce(fd, bytes);
+}
+
 bool LinuxDisk::hidesNames(int directory) {
     return platform::hidesNames(directory);
 }

@@ -37,6 +37,7 @@ public:
     int syncFileSystem(int fd) override;
     int orderData(int fd) override;
 
+    [[nodiscard]] ssize_t read(int fd, std::span<std::uint8_t> bytes) override;
     [[nodiscard]] bool hidesNames(int directory) override;
 
 private:

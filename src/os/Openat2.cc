@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <chrono>
 #include <cstdint>
 #include <dirent.h>
 #include <fcntl.h>
@@ -13,6 +14,7 @@
 #include <string_view>
 #include <sys/stat.h>
 #include <sys/syscall.h>
+#include <thread>
 #include <unistd.h>
 
 namespace zor::platform {
@@ -21,6 +23,9 @@ namespace {
 
 /// The kernel answers EAGAIN when a rename raced with its check; a client that renames without pause must not hold us.
 constexpr int attemptsMax = 128;
+/// From here on with a pause: one who renames at a higher priority gets to its end.
+constexpr int attemptsAtOnce = 8;
+constexpr std::chrono::microseconds pause{100};
 
 std::expected<FileDescriptor, int> resolve(int directory, const char* path, int flags, mode_t mode,
                                            std::uint64_t rules) {
@@ -34,6 +39,8 @@ std::expected<FileDescriptor, int> resolve(int directory, const char* path, int 
             return FileDescriptor(static_cast<int>(fd));
         if (errno != EINTR && (errno != EAGAIN || attempt >= attemptsMax))
             return std::unexpected(errno);
+        if (attempt >= attemptsAtOnce)
+            std::this_thread::sleep_for(pause);
     }
 }
 
@@ -134,6 +141,14 @@ std::expected<std::vector<std::string>, int> directoryNames(int directory) {
     }
     std::ranges::sort(names);
     return names;
+}
+
+ssize_t readOnce(int fd, std::span<std::uint8_t> bytes) {
+    for (;;) {
+        const ssize_t count = ::read(fd, bytes.data(), bytes.size());
+        if (count >= 0 || errno != EINTR)
+            return count >= 0 ? count : -errno;
+    }
 }
 
 std::vector<std::string> directoryNamesIfAny(int directory) {

@@ -7,6 +7,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <expected>
+#include <span>
 #include <string>
 #include <sys/types.h>
 #include <vector>
@@ -42,6 +43,8 @@ namespace zor::platform {
 /// Everything from the descriptor's offset on. EFBIG when that is more than `bytesMax`, EINVAL when it is no regular
 /// file.
 [[nodiscard]] std::expected<std::string, int> readSmallFile(int fd, std::size_t bytesMax);
+/// read(2) that no signal ends: the count, or the negative errno.
+[[nodiscard]] ssize_t readOnce(int fd, std::span<std::uint8_t> bytes);
 
 // The names in a directory that only root writes to. Any thread.
 

@@ -2,8 +2,9 @@
 // Every call of the daemon that changes or syncs the disk goes through this interface, one method a system call.
 //
 // That is what makes crash safety testable: the real make passes each call on, a counting make fails it or ends the
-// process at the N-th, a recording make keeps a log from which the states that a power cut may leave are built. Reading
-// calls (openat2, fstat, getdents, read) change nothing and are made directly.
+// process at the N-th, a recording make keeps a log from which the states that a power cut may leave are built. Calls
+// that only look (openat2, fstat, getdents) change nothing and are made directly, but for those on whose failure a loss
+// may hang.
 //
 // Calls act on descriptors or on one name (never a path) inside an open directory; nothing here follows a link in the
 // last component. All return 0 or a descriptor or count when they succeed, else the negative errno. Any thread.
@@ -60,9 +61,11 @@ public:
     /// become durable before it. Commits nothing by itself.
     virtual int orderData(int fd) = 0;
 
-    // Looking. Changes nothing that lasts, but asks by a call that could.
-    /// Whether an encryption whose key is away hides what is in the directory: nothing that is not found there is known
-    /// to be missing, and no name that is listed is one.
+    // Looking. Changes nothing that lasts.
+    /// At the descriptor's offset; 0 at the end.
+    [[nodiscard]] virtual ssize_t read(int fd, std::span<std::uint8_t> bytes) = 0;
+    /// Asks by a call that could change something. Whether an encryption whose key is away hides what is in the
+    /// directory: nothing that is not found there is known to be missing, and no name that is listed is one.
     [[nodiscard]] virtual bool hidesNames(int directory) = 0;
 };
 

@@ -186,7 +186,7 @@ Result<std::shared_ptr<ZORMetadata>> MetadataReader::read(const char* name) cons
 std::expected<std::shared_ptr<ZORMetadata>, MetadataRefusal> MetadataReader::judge(const char* name) const {
     const ContainerPlace place(parentPath_, name);
     const std::string relative = std::string(name) + "/" + names::metadataFile;
-    const auto bytes = fs::readOwnedFile(directory_, relative.c_str(), fs::metadataFileBytesMax, formerOwner_);
+    const auto bytes = fs::readOwnedFile(disk_, directory_, relative.c_str(), fs::metadataFileBytesMax, formerOwner_);
     if (!bytes) {
         const bool hidden = bytes.error() == ENOENT && fs::hidesNamesBelow(disk_, directory_, name);
         const int number = hidden ? ENOKEY : bytes.error();

@@ -700,7 +700,8 @@ TEST(Content, AnotherDirectoryInTheContainersPlace) {
     if (::geteuid() != 0)
         GTEST_SKIP() << "only root can make another user's directory";
     const World world;
-    const auto open = [](const std::string& path) { return openNewContainer(path, MountFence::Kind::home); };
+    zor::platform::LinuxDisk disk;
+    const auto open = [&](const std::string& path) { return openNewContainer(disk, path, MountFence::Kind::home); };
     const std::string place = world.path("/home/Containers");
     const std::string application = place + "/Data/Application";
     std::filesystem::create_directories(application);

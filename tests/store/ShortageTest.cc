@@ -41,22 +41,39 @@ protected:
     World world;
 };
 
-// Goal: a launch that cannot read the journals deletes nothing that they name. Method: a stopped replace, something
-// else in the journals' place, then requests, and a launch as it should be.
+// Goal: a launch that cannot read the journals deletes nothing that they name, and nothing is made in its place.
+// Method: a stopped replace, something else in the journals' place or reads that fail, then requests, and a launch as
+// it should be.
 TEST_F(Shortage, JournalsThatCannotBeReadKeepWhatTheyName) {
     const FoundContainer old = world.make("old");
-    stopAReplaceOf(old);
     const std::string there = world.path(journals);
-    std::filesystem::rename(there, there + ".aside");
-    world.write(journals, "no directory");
-    relaunch();
-    EXPECT_EQ(codeOf(world.create("old")), ErrorCode::journalUnusable);
-    EXPECT_TRUE(world.create("another"));
-    std::filesystem::remove(there);
-    std::filesystem::rename(there + ".aside", there);
-    for (int launch = 0; launch < 2; ++launch) {
-        EXPECT_EQ(world.make("old").path, old.path);
+    constexpr int noMemory = -1; // thrown
+    constexpr int noDirectory = 0;
+    for (const int trouble : {noDirectory, EIO, ENOMEM, noMemory}) {
+        SCOPED_TRACE(trouble);
+        stopAReplaceOf(old);
+        if (trouble == noDirectory) {
+            std::filesystem::rename(there, there + ".aside");
+            world.write(journals, "no directory");
+        }
+        world.disk().unreadable = [&](int fd) {
+            const auto path = std::filesystem::read_symlink("/proc/self/fd/" + std::to_string(fd)).string();
+            const bool fails = trouble != noDirectory && path.starts_with(there);
+            return fails && trouble == noMemory ? throw std::bad_alloc() : fails ? trouble : 0;
+        };
         relaunch();
+        EXPECT_EQ(codeOf(world.create("old")),
+                  trouble == noMemory ? ErrorCode::exceptionCaught : ErrorCode::journalUnusable);
+        EXPECT_TRUE(trouble == noMemory || world.create("another"));
+        world.disk().unreadable = nullptr;
+        if (trouble == noDirectory) {
+            std::filesystem::remove(there);
+            std::filesystem::rename(there + ".aside", there);
+        }
+        for (int launch = 0; launch < 2; ++launch) {
+            EXPECT_EQ(world.make("old").path, old.path);
+            relaunch();
+        }
     }
 }
 

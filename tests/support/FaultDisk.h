@@ -59,6 +59,12 @@ public:
         return (locked && locked(directory)) || InterceptedDisk::hidesNames(directory);
     }
     std::function<bool(int directory)> locked;
+    /// Files that cannot be read: the errno, or 0.
+    [[nodiscard]] ssize_t read(int fd, std::span<std::uint8_t> bytes) override {
+        const int refused = unreadable ? unreadable(fd) : 0;
+        return refused != 0 ? -refused : InterceptedDisk::read(fd, bytes);
+    }
+    std::function<int(int fd)> unreadable;
 
 protected:
     ssize_t intercept(const DiskCallInfo& info, const Make& make) override;

@@ -75,6 +75,7 @@ public:
     int orderData(int fd) override {
         return pass({DiskCall::orderData, "", fd}, [&] { return inner_.orderData(fd); });
     }
+    [[nodiscard]] ssize_t read(int fd, std::span<std::uint8_t> bytes) override { return inner_.read(fd, bytes); }
     [[nodiscard]] bool hidesNames(int directory) override { return inner_.hidesNames(directory); }
 
 protected:

@@ -147,7 +147,8 @@ int Installation::install(Client& client) {
               .user = userOf(target_),
               .identifier = target_.identifier,
               .uuid = made->uuid};
-    const auto container = content::openNewContainer(freshPath_, fenceKind(target_.containerClass));
+    zor::platform::LinuxDisk disk;
+    const auto container = content::openNewContainer(disk, freshPath_, fenceKind(target_.containerClass));
     if (!container)
         return failed(container.error().what);
     {
@@ -161,7 +162,6 @@ int Installation::install(Client& client) {
                                                       .share = progress.share});
                                              },
                                          .wantsShare = display.isShown()};
-        zor::platform::LinuxDisk disk;
         const auto filled = content::putContent(disk, container->get(), source_, observer, receivedSignal);
         if (!filled)
             return failed(filled.error().what, filled.error().advice);

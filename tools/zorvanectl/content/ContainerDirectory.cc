@@ -55,9 +55,10 @@ Outcome<FileDescriptor> openToldContainer(const std::string& path, MountFence::K
     return std::move(*container);
 }
 
-Outcome<FileDescriptor> openNewContainer(const std::string& path, MountFence::Kind kind) {
+Outcome<FileDescriptor> openNewContainer(zor::platform::Disk& disk, const std::string& path, MountFence::Kind kind) {
     auto container = openToldContainer(path, kind);
-    if (container && !zor::fs::readOwnedFile(container->get(), zor::names::metadataFile, zor::fs::metadataFileBytesMax))
+    if (container &&
+        !zor::fs::readOwnedFile(disk, container->get(), zor::names::metadataFile, zor::fs::metadataFileBytesMax))
         return failed("somebody put something else in the place of the new container");
     return container;
 }

@@ -5,6 +5,7 @@
 #include "Failure.h"
 #include "fs/MountFences.h"
 #include "os/FileDescriptor.h"
+#include "platform/Disk.h"
 
 #include <string>
 
@@ -20,6 +21,7 @@ using zor::fs::MountFence;
 /// The same of a container that is to be filled. Whoever owns a directory above it can put another one in its place
 /// meanwhile, and what is written here is written by root: so it has to hold the daemon's record, which no other user
 /// can make.
-[[nodiscard]] Outcome<zor::platform::FileDescriptor> openNewContainer(const std::string& path, MountFence::Kind kind);
+[[nodiscard]] Outcome<zor::platform::FileDescriptor> openNewContainer(zor::platform::Disk& disk,
+                                                                      const std::string& path, MountFence::Kind kind);
 
 } // namespace zorvanectl::content
