@@ -144,16 +144,23 @@ struct StoppedReplace {
     FileURL newUrl;
     FileURL destUrl;
 };
-StoppedReplace stopAfterFirstMove(Device& device, const Acknowledged& old) {
+StoppedReplace stopAfterFirstMove(Device& device, const Acknowledged& old, OldOne kind) {
     const Acknowledged fresh = makeWithContent(device, true, "new");
     const UUID uuid = UUID::random();
     StoreServices& services = device.daemon->world.services().store();
     const FileURL oldUrl = FileURL::directory(old.path);
-    const ReplaceJournal journal{.oldUrl = oldUrl,
-                                 .newUrl = FileURL::directory(fresh.path),
-                                 .stagingUrl =
-                                     services.configuration.stagingDirectory().appendingDirectory(uuid.string()),
-                                 .destUrl = oldUrl.deletingLastPathComponent().appendingDirectory(nameOf(fresh.path))};
+    const bool keepsUuid = kind == OldOne::replacedAndUuidKept;
+    if (keepsUuid) {
+        const auto record =
+            services.cache.containerForUser(mobileUser, changed.containerClass, &changed.identifier, true).value();
+        record->setUuid(uuidOf(old));
+        must(record->writeMetadataToDiskWithError(services.log, services.fileManager).has_value(), "no old UUID");
+    }
+    const ReplaceJournal journal{
+        .oldUrl = oldUrl,
+        .newUrl = FileURL::directory(fresh.path),
+        .stagingUrl = services.configuration.stagingDirectory().appendingDirectory(uuid.string()),
+        .destUrl = keepsUuid ? oldUrl : oldUrl.deletingLastPathComponent().appendingDirectory(nameOf(fresh.path))};
     const auto written = journal._writeToDiskReplaceAt(
         services.log, services.fileManager, ReplaceJournal::urlFor(services.configuration.replaceDirectory(), uuid));
     must(written && services.fileManager.moveItemAtURL(oldUrl, journal.stagingUrl) &&
@@ -163,34 +170,40 @@ StoppedReplace stopAfterFirstMove(Device& device, const Acknowledged& old) {
 }
 
 /// A launch that finds a replace whose first move was made. Whatever stops it, a later one puts the old one back.
-Scenario recovery() {
+Scenario recovery(const std::string& name, OldOne kind) {
     return changing(
-        "recovery of a replace", [](Device& device, const Acknowledged& old) { stopAfterFirstMove(device, old); },
+        "recovery of a " + name,
+        [=](Device& device, const Acknowledged& old) { stopAfterFirstMove(device, old, kind); },
         [](Device& device, const Acknowledged&) {
             device.daemon->launch();
             return true;
         },
         [](const std::string& root, bool, const Acknowledged& old) -> std::string {
             const Changed now = look(root);
-            return now.content == "old" && now.name == nameOf(old.path) ? "" : "the content is " + now.content;
+            return now.content == "old" && now.name == nameOf(old.path) && now.uuid == old.uuid
+                       ? ""
+                       : "the content is " + now.content;
         });
 }
 
 /// A launch that finds both moves made, the second by a daemon that was killed before it synced it. Where the power
 /// undoes that move, the old one must not be on death row without a journal.
-Scenario recoveryOfADoneReplace() {
+Scenario recoveryOfADone(const std::string& name, OldOne kind) {
     const auto stopped = std::make_shared<StoppedReplace>();
     return changing(
-        "recovery of a replace that was done",
-        [=](Device& device, const Acknowledged& old) { *stopped = stopAfterFirstMove(device, old); },
+        "recovery of a done " + name,
+        [=](Device& device, const Acknowledged& old) { *stopped = stopAfterFirstMove(device, old, kind); },
         [=](Device& device, const Acknowledged&) {
             if (device.daemon->world.services().store().fileManager.moveItemAtURL(stopped->newUrl, stopped->destUrl))
                 device.daemon->launch();
             return true;
         },
-        [](const std::string& root, bool, const Acknowledged&) -> std::string {
+        [=](const std::string& root, bool, const Acknowledged& old) -> std::string {
             const Changed now = look(root);
-            return now.content == "old" || now.content == "new" ? "" : "the content is " + now.content;
+            const bool otherUuid = now.uuid != old.uuid && (now.content == "old" || kind != OldOne::replaced);
+            return (now.content == "old" || now.content == "new") && !otherUuid
+                       ? ""
+                       : "the content is " + now.content + " under " + now.uuid;
         });
 }
 
@@ -283,11 +296,15 @@ Scenario newDirectoryName() {
 } // namespace
 
 std::vector<Scenario> changeScenarios() {
-    return {atHome(replacement("replace", OldOne::replaced)),
-            replacement("replace that keeps the UUID", OldOne::replacedAndUuidKept),
+    const std::string replace = "replace";
+    const std::string keeping = "replace that keeps the UUID";
+    return {atHome(replacement(replace, OldOne::replaced)),
+            replacement(keeping, OldOne::replacedAndUuidKept),
             replacement("replace of nothing", OldOne::none),
-            atHome(recovery()),
-            atHome(recoveryOfADoneReplace()),
+            atHome(recovery(replace, OldOne::replaced)),
+            recovery(keeping, OldOne::replacedAndUuidKept),
+            atHome(recoveryOfADone(replace, OldOne::replaced)),
+            recoveryOfADone(keeping, OldOne::replacedAndUuidKept),
             wiping(),
             structure(),
             infoValue(),

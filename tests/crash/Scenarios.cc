@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "crash/Scenarios.h"
 
+#include "support/FaultDisk.h"
 #include "support/Files.h"
 #include "support/LongRun.h"
 #include "world/UpcallPackets.h"
@@ -11,6 +12,7 @@
 #include <memory>
 #include <set>
 #include <stdexcept>
+#include <utility>
 
 namespace zor::support {
 
@@ -68,6 +70,30 @@ Scenario creation(const std::string& name, ContainerClass containerClass, std::u
         return staged.empty() ? "" : staged.front() + " is left in staging";
     };
     return scenario;
+}
+
+/// A client whose daemon was killed between the move of a new container and its sync asks the next daemon again, and is
+/// told of what that one finds.
+Scenario lookupAfterAKill() {
+    const Request request{"com.example.killed", ContainerClass::dataApplication, mobileUser};
+    return scenarioOf(
+        "look-up after a kill", [](Device&) {},
+        [request](Device& device) {
+            FaultDisk killing(*device.disk);
+            device.restart(killing);
+            killing.arm({.kind = FaultKind::stop, .filter = [moved = false](const DiskCallInfo& info) mutable {
+                             const bool isMove = info.call == DiskCall::rename;
+                             return std::exchange(moved, moved || isMove) && !isMove;
+                         }});
+            try {
+                device.create(request);
+            } catch (const ProcessStopped&) {
+                device.daemon.reset();
+            }
+            device.restart(*device.disk);
+            device.create(request);
+        },
+        {request});
 }
 
 Scenario transientAgain() {
@@ -234,6 +260,7 @@ std::vector<Scenario> storeScenarios() {
         creation("system", ContainerClass::dataSystem, systemUser),
         creation("well-known system", ContainerClass::dataSystem, systemUser, "com.veltra.settingsd"),
         creation("system group", ContainerClass::sharedSystemGroup, systemUser, "systemgroup.new"),
+        atHome(lookupAfterAKill()),
         atHome(transientAgain()),
         atHome(deathRow()),
         entitlementFile(),

@@ -131,8 +131,14 @@ Device::Device(const std::string& parent, Home whereHome) : root(parent), home(w
         throw std::runtime_error("cannot mount a home");
 }
 
-void Device::start(platform::Disk& onDisk, fs::Durability::Probe probe) {
+void Device::start(platform::Disk& onDisk, fs::Durability::Probe theProbe) {
     disk = &onDisk;
+    probe = theProbe;
+    restart(onDisk);
+}
+
+void Device::restart(platform::Disk& onDisk) {
+    daemon.reset();
     daemon = std::make_unique<StoreDaemon>(root.path(), marker, onDisk, probe);
     daemon->launch();
 }

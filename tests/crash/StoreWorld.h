@@ -73,6 +73,8 @@ enum class Home { onRoot, mounted };
 struct Device {
     explicit Device(const std::string& parent, Home home = Home::onRoot);
     void start(platform::Disk& onDisk, fs::Durability::Probe probe);
+    /// Another daemon in the place of the one that there is, on that disk.
+    void restart(platform::Disk& onDisk);
     /// Creates a container and notes it as promised. False when the daemon did not.
     bool create(const Request& request);
     /// The same without a promise; what is done to it takes it away or changes its place. Throws when it cannot.
@@ -90,6 +92,7 @@ struct Device {
     bool acted = false;
     /// What the daemon runs on.
     platform::Disk* disk = nullptr;
+    fs::Durability::Probe probe = journalEverywhere;
     std::unique_ptr<StoreDaemon> daemon;
 };
 
