@@ -335,6 +335,10 @@ void ContainerCheck::checkInside(const Container& container) {
 }
 
 void ContainerCheck::checkOwnDirectory(const Container& container, const ContainerLayout& layout) {
+    if (look_.options().unsavedInfo.contains(container.record->uuid().string()))
+        describe(look_.add(FindingCode::infoUnsaved, container.url.appendingFile(names::metadataFile),
+                           "does not hold the info values that the daemon shows", Mender::nextWrite),
+                 container);
     struct stat status{};
     const bool ownersCount = look_.device().ownersCount();
     if (::fstat(container.descriptor, &status) != 0)

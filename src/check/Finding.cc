@@ -62,6 +62,11 @@ constexpr std::array<FindingPage, findingCodeCount> pages = {{
      "ask for another class and then for the recorded one again: zorvanectl protect. A change that waits for an unlock "
      "is "
      "not reported while the daemon runs"},
+    {FindingCode::infoUnsaved, "info-unsaved", fault,
+     "the daemon shows info values of a container, among them the recorded protection class, that are not on the disk",
+     "the file system was full, damaged or read-only when they were set",
+     "the next start of the daemon shows the old ones",
+     "see to the file system, and set a value again: zorvanectl info set"},
     {FindingCode::mappingDangling, "mapping-dangling", fault, "a sandbox mapping leads to no container",
      "the daemon was stopped between the move of a container and its mapping",
      "a sandbox that is built from it does not find the container", "nothing: the next start of the daemon removes it"},

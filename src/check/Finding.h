@@ -27,6 +27,7 @@ enum class FindingCode : std::uint8_t {
     subdirectoryAttributes,
     wrongShape,
     protectionDiffers,
+    infoUnsaved,
     mappingDangling,
     stagingLeftover,
     deathRowItem,
@@ -43,7 +44,7 @@ enum class FindingCode : std::uint8_t {
     bootMarkerMissing,
     unexamined,
 };
-inline constexpr std::size_t findingCodeCount = 25;
+inline constexpr std::size_t findingCodeCount = 26;
 
 /// The one who puts it right.
 enum class Mender : std::uint8_t {

@@ -29,6 +29,8 @@ struct CheckOptions {
         servedPath;
     /// UUIDs of containers whose data-protection class is being changed.
     std::set<std::string> changingProtection;
+    /// UUIDs of containers whose info values the daemon could not write.
+    std::set<std::string> unsavedInfo;
     /// Between the two looks; 0: one look alone, for a store that nobody works on.
     std::chrono::milliseconds pause{200};
     /// In place of the system's own.

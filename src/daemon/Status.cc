@@ -85,6 +85,15 @@ void Status::addProtection(plist::Dictionary& counters) {
     counters.set("HeldAssertions", plist::Array(held.begin(), held.end()));
 }
 
+void Status::addUnsavedInfo(plist::Dictionary& counters) {
+    if (!composition_.store().someInfoIsNotSaved)
+        return;
+    plist::Array uuids;
+    for (const UUID& uuid : composition_.cache().withUnsavedInfo())
+        uuids.emplace_back(uuid.string());
+    counters.set("UnsavedInfo", std::move(uuids));
+}
+
 void Status::addDeathRow(plist::Dictionary& counters) {
     const DeathRowReport::Left left = composition_.store().deathRow.left();
     counters.set("UndeletedItems", left.count);
@@ -121,6 +130,7 @@ plist::Dictionary Status::counters() {
     addProtection(counters);
     addSetup(counters);
     addDeathRow(counters);
+    addUnsavedInfo(counters);
     if (const auto lost = composition_.entitlements().lostFile())
         counters.set("UnreadableEntitlementFile", lost->path());
     platformCounters_(counters);

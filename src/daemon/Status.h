@@ -29,6 +29,7 @@ private:
     void addProtection(plist::Dictionary& counters);
     void addSetup(plist::Dictionary& counters);
     void addDeathRow(plist::Dictionary& counters);
+    void addUnsavedInfo(plist::Dictionary& counters);
     void addEntitlements(plist::Dictionary& status);
 
     Composition& composition_;

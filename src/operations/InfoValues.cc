@@ -85,10 +85,15 @@ Result<void> ZORClientConnection::setInfoValue(const plist::Value* value, const 
         const ZORMetadata::Info before = record->info();
         record->setInfo(std::make_shared<const plist::Dictionary>(std::move(info)));
         if (auto written = record->writeMetadataToDiskWithError(services_.log, services_.fileManager); !written) {
-            if (cannotBeHeld(written.error()))
+            if (cannotBeHeld(written.error())) {
                 record->setInfo(before);
+                return written;
+            }
+            record->setInfoIsSaved(false);
+            services_.someInfoIsNotSaved = true;
             return written;
         }
+        record->setInfoIsSaved(true);
         const auto added =
             services_.cache.addContainerMetadata(record, address.userId, record->place(), record->transient());
         if (!added)

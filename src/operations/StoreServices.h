@@ -59,6 +59,8 @@ struct StoreServices {
     /// A pass over death row that nobody is told of is queued and has not begun.
     std::atomic<bool> deletionPassWaits{false};
     WaitingReplaces waitingReplaces{};
+    /// Some record's info may not be on the disk: worth a look through the cache.
+    std::atomic<bool> someInfoIsNotSaved{false};
 };
 
 /// Runs `job` later on a queue; the daemon counts as busy until it has run.

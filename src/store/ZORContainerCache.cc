@@ -491,4 +491,14 @@ ZORContainerCache::Counts ZORContainerCache::counts() {
     return counts;
 }
 
+std::vector<UUID> ZORContainerCache::withUnsavedInfo() {
+    std::vector<UUID> uuids;
+    const MutexLock held(cacheLock_);
+    for (const auto& [key, cache] : caches_)
+        for (const Entry& entry : cache.entries)
+            if (!entry.record->infoIsSaved())
+                uuids.push_back(entry.record->uuid());
+    return uuids;
+}
+
 } // namespace zor

@@ -103,6 +103,8 @@ public:
         std::size_t records = 0;
     };
     [[nodiscard]] Counts counts() ZOR_EXCLUDES(cacheLock_);
+    /// Containers of which clients are shown info values that are not on the disk. Looks at all records.
+    [[nodiscard]] std::vector<UUID> withUnsavedInfo() ZOR_EXCLUDES(cacheLock_);
 
 private:
     struct Entry {

@@ -82,6 +82,11 @@ public:
     [[nodiscard]] bool durable() const { return durable_.load(std::memory_order_acquire); }
     void setDurable(bool durable) { durable_.store(durable, std::memory_order_release); }
 
+    /// False from a write of changed info values that failed until one that did not: clients are shown what is not on
+    /// the disk. Under the container's lock for writing; read without.
+    [[nodiscard]] bool infoIsSaved() const { return infoIsSaved_.load(std::memory_order_relaxed); }
+    void setInfoIsSaved(bool isSaved) { infoIsSaved_.store(isSaved, std::memory_order_relaxed); }
+
     /// The dictionary that the file holds.
     [[nodiscard]] plist::Dictionary fileContent() const;
 
@@ -98,6 +103,7 @@ private:
     bool transient_ = false;
     std::atomic<bool> existed_{false};
     std::atomic<bool> durable_{true};
+    std::atomic<bool> infoIsSaved_{true};
 };
 
 enum class CheckClassPath { no, yes };

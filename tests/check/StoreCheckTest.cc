@@ -326,6 +326,39 @@ TEST(StoreCheckTest, KnowsWhatIsNoFault) {
     EXPECT_FALSE(isWhole(store.check(options)));
 }
 
+// Goal: info values, or a recorded protection class, that the daemon shows and could not write are found, and are not
+// any more once they are written. Method: a disk that is full for one of two writes.
+TEST(StoreCheckTest, FindsInfoThatWasNotWritten) {
+    Store store;
+    const auto set = [&] {
+        const std::string key = "key";
+        const plist::Value value("value");
+        return store.world.daemonsClient()
+            .setInfoValue(&value, &key,
+                          {.userId = 501,
+                           .uuid = UUID::parse(store.dataUuid),
+                           .identifier = "org.data",
+                           .containerClass = ContainerClass::dataApplication},
+                          UseLocking::yes)
+            .has_value();
+    };
+    const auto check = [&] {
+        CheckOptions options{.pause = std::chrono::milliseconds(0)};
+        for (const UUID& one : store.world.services().cache().withUnsavedInfo())
+            options.unsavedInfo.insert(one.string());
+        return store.check(options);
+    };
+    store.world.refuse(support::DiskCall::write, ENOSPC);
+    EXPECT_FALSE(set());
+    const auto findings = check();
+    ASSERT_EQ(findings.size(), 1U) << textOf(findings);
+    EXPECT_EQ(findings[0].code, FindingCode::infoUnsaved);
+    EXPECT_TRUE(store.world.services().store().someInfoIsNotSaved);
+    store.world.disk().disarm();
+    EXPECT_TRUE(set());
+    EXPECT_EQ(textOf(check()), "");
+}
+
 // Goal: what a request in flight shows is not reported. Method: threads that make, wipe and delete containers without
 // pause, and checks meanwhile.
 TEST(StoreCheckTest, ReportsNothingOfWhatIsInFlight) {

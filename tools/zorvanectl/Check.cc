@@ -57,6 +57,7 @@ CheckOptions optionsFor(const CheckedSystem& system, const zorvane::ConnectOptio
     options.servedPath = servedPathOf(quick);
     for (const PendingChange& change : pendingChangesIn(*status))
         options.changingProtection.insert(change.uuid);
+    options.unsavedInfo = unsavedInfoIn(*status);
     return options;
 }
 

@@ -16,4 +16,9 @@ std::vector<PendingChange> pendingChangesIn(const zorvane::Value& status) {
     return changes;
 }
 
+std::set<std::string> unsavedInfoIn(const zorvane::Value& status) {
+    const nlohmann::json counters = toJson(status).value("Counters", nlohmann::json::object());
+    return counters.value("UnsavedInfo", std::set<std::string>());
+}
+
 } // namespace zorvanectl
