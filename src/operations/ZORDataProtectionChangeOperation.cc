@@ -10,6 +10,7 @@
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
 #include <thread>
+#include <unistd.h>
 
 namespace zor {
 
@@ -194,7 +195,7 @@ Result<platform::FileDescriptor> ZORDataProtectionChangeOperation::openContainer
 
 Result<void> ZORDataProtectionChangeOperation::walk(int container, const std::vector<Item>& items) {
     namesMet_.forgetAll();
-    foreignNames_ = 0;
+    foreignFiles_ = 0;
     std::optional<ZORError> failure;
     for (const Item& item : items) {
         fs::TreeWalker walker(fs::WalkStatus::typeOnly);
@@ -216,11 +217,11 @@ Result<void> ZORDataProtectionChangeOperation::walk(int container, const std::ve
 }
 
 void ZORDataProtectionChangeOperation::saySharedFiles() const {
-    const std::uint64_t left = namesMet_.unfinished() + foreignNames_;
+    const std::uint64_t left = namesMet_.unfinished() + foreignFiles_;
     if (left > 0)
         services_.log.write(logLevelNotice, passFunction,
-                            "Left the protection class of %llu hard-linked files in %s as it is: they have names "
-                            "outside, or another owner",
+                            "Left the protection class of %llu files in %s as it is: they have names outside, or "
+                            "another owner",
                             static_cast<unsigned long long>(left), dataContainerMetadata_->url().c_str());
 }
 
@@ -285,11 +286,12 @@ Result<void> ZORDataProtectionChangeOperation::setClass(const WalkEntry& entry, 
 bool ZORDataProtectionChangeOperation::isShared(const struct stat& status) {
     // The container's owner can rename during the walk, so that one name is met twice; by that he reaches what is his
     // own anyway, and nothing else.
-    if (status.st_nlink <= 1)
-        return false;
     if (status.st_uid == owner_)
-        return !namesMet_.wasLast(status);
-    ++foreignNames_;
+        return status.st_nlink > 1 && !namesMet_.wasLast(status);
+    // The container's owner can move another's file in. What root put there with one name is the container's.
+    if (status.st_nlink <= 1 && (status.st_uid == 0 || status.st_uid == ::geteuid()))
+        return false;
+    ++foreignFiles_;
     return true;
 }
 

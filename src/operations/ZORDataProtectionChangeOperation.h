@@ -118,7 +118,7 @@ private:
     // Of one pass.
     uid_t owner_ = 0; // the container's
     fs::NamesMet namesMet_;
-    std::uint64_t foreignNames_ = 0; // of files with several names and another owner than the container's
+    std::uint64_t foreignFiles_ = 0; // of another owner than the container's
 };
 
 } // namespace zor

@@ -291,6 +291,7 @@ TEST_F(Protection, HostileOwner) {
     files::create_hard_link(world.path(own), documents / "own");
     ASSERT_EQ(::mkfifo((documents / "fifo").c_str(), 0666), 0);
     put("Documents/one", 3);
+    put("Documents/others", 3);
     put("Documents/leased", 3);
     std::signal(SIGIO, SIG_IGN); // how a holder hears of an open
     platform::FileDescriptor leased(::open((documents / "leased").c_str(), O_RDWR | O_CLOEXEC));
@@ -299,6 +300,7 @@ TEST_F(Protection, HostileOwner) {
     if (::geteuid() == 0) { // else all files are the owner's own
         ASSERT_EQ(::chown((documents / "one").c_str(), mobile, mobile), 0);
         ASSERT_EQ(::chown((documents / "own").c_str(), mobile, mobile), 0);
+        ASSERT_EQ(::chown((documents / "others").c_str(), mobile + 1, mobile + 1), 0);
         // Between the two directories the owner moves another's file on, so that its one name is met twice.
         world.disk().arm({.filter = [&](const auto&) {
             (void)::rename((documents / "hard").c_str(), (container.path + "/Library/hard").c_str());
@@ -312,6 +314,7 @@ TEST_F(Protection, HostileOwner) {
     EXPECT_EQ(classOf("etc/outside/file"), 3);
     EXPECT_EQ(classOf(own), 3);                    // its other name is outside, though it is the same user's
     EXPECT_EQ(classOf(path + "Documents/one"), 1); // all its names are in the container
+    EXPECT_EQ(classOf(path + "Documents/others"), ::geteuid() == 0 ? 3 : 1);
     EXPECT_EQ(std::ranges::count_if(world.log.take(),
                                     [](const support::LogLine& line) {
                                         return line.level == 5 && line.message.starts_with("Left the protection class");
