@@ -14,7 +14,7 @@ namespace zor::bench {
 namespace {
 
 constexpr ContainerClass containerClass = ContainerClass::dataApplication;
-/// Lookups leave a removal, which has the lowest priority, little of two processors: it is not waited for.
+/// Lookups leave a removal, which has a lower priority, little of two processors: it is not waited for.
 constexpr double secondsMax = 15;
 
 /// Work of other clients, on a thread of its own; what it throws comes out of `wait`.

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// A serial queue with one thread. A background queue's thread runs only when the processors and the disk have nothing
-// else to do, so its jobs hold no lock that others wait for.
+// A serial queue with one thread. A background queue's thread has less of the processors than others, and of the disk
+// what nobody else wants.
 //
 // Destroying a queue waits for the running job and for all that are queued, including those that they queue; of a
 // queue that is suspended, or was never started, the queued jobs are dropped (destroyed without having run). No other
