@@ -157,10 +157,15 @@ void HostileOwner::swapOnce(const std::string& victim) {
 
 void HostileOwner::swap() {
     while (!session_.stopped) {
+        session_.hostileTree.lock();
         const auto victims = victimsBelow(session_.root() + "/" + hostileHome);
-        for (unsigned i = 0; i < 8 && !session_.stopped; ++i)
-            swapOnce(victims[swapping_.upTo(victims.size())]);
-        nameAnothersSo(victims[swapping_.upTo(placesOnTheWay)]);
+        session_.hostileTree.unlock();
+        {
+            const std::lock_guard alone(session_.hostileTree);
+            for (unsigned i = 0; i < 8 && !session_.stopped; ++i)
+                swapOnce(victims[swapping_.upTo(victims.size())]);
+            nameAnothersSo(victims[swapping_.upTo(placesOnTheWay)]);
+        }
         sleepMilliseconds(1);
     }
 }

@@ -81,6 +81,8 @@ public:
     Gate requests;
     std::atomic<Trouble> trouble{Trouble::none};
     std::atomic<bool> locked{false};
+    /// Held by who moves things about in the hostile user's home, and by who mounts there.
+    std::mutex hostileTree;
     /// Clients end at their next request.
     std::atomic<bool> stopped{false};
 

@@ -2,7 +2,10 @@
 #include "soak/Surroundings.h"
 
 #include "soak/HostileOwner.h"
+#include "support/HangingFileSystem.h"
 
+#include <chrono>
+#include <filesystem>
 #include <fstream>
 #include <nlohmann/json.hpp>
 #include <set>
@@ -39,6 +42,8 @@ void Surroundings::happen(unsigned pauseMillisecondsMax) {
         conditions_.oneOfTwoSpeaks(choices_.oneIn(2));
     else if (lot < 78)
         bootWithoutAHome();
+    else if (lot < 82)
+        hang();
     else if (lot < 90)
         lock(!session_.locked);
     else if (lot < 95 && diskCanBeFilled_)
@@ -125,6 +130,32 @@ void Surroundings::starve() {
     ::prlimit(pid, RLIMIT_NOFILE, &before, nullptr);
     enter(Trouble::none);
     session_.did("device", "descriptors again");
+}
+
+void Surroundings::hang() {
+    constexpr double endSecondsMax = 8;
+    std::string place = session_.root() + "/" + hostileHome;
+    const std::lock_guard alone(session_.hostileTree);
+    std::error_code error;
+    for (auto levels = choices_.upTo(5); levels > 0; --levels) {
+        // The home, what leads to its containers, and one of them.
+        const std::filesystem::directory_iterator entries(place, error);
+        if (error || entries == std::filesystem::directory_iterator())
+            break;
+        place = entries->path();
+    }
+    const support::HangingFileSystem hanging(place, hostileUser);
+    session_.did("device", hanging.mounted() ? "hanging mount" : "no hanging mount");
+    sleepMilliseconds(200 + choices_.upTo(800));
+    if (!choices_.oneIn(2))
+        return;
+    const auto begin = std::chrono::steady_clock::now();
+    const int status = session_.daemon().terminate();
+    const std::chrono::duration<double> time = std::chrono::steady_clock::now() - begin;
+    if (status != 0 || time.count() > endSecondsMax)
+        session_.found("with a hanging mount at " + place + " an end takes " + std::to_string(time.count()) +
+                       " s and gives exit status " + std::to_string(status));
+    session_.daemon().start();
 }
 
 void Surroundings::settle() {

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // What happens to the daemon: kills, orderly ends, boots, locks of the device, a full disk, too few descriptors,
-// homes that are missing. And what must hold whenever it starts again.
+// homes that are missing, mounts that hang. And what must hold whenever it starts again.
 #pragma once
 
 #include "soak/Conditions.h"
@@ -36,6 +36,8 @@ private:
     void lock(bool locked);
     void fillDisk();
     void starve();
+    /// A file system that never answers, in the hostile user's home: nobody else waits, and the daemon ends.
+    void hang();
     void enter(Trouble trouble);
 
     Session& session_;

@@ -127,6 +127,8 @@ int soak(const Options& options) {
     const SmallDisk disk;
     if (!disk.isMounted())
         std::puts("skipped: a full disk, and clients of several users; only root may mount and become others");
+    if (::access("/dev/fuse", R_OK | W_OK) != 0 || !disk.isMounted())
+        std::puts("skipped: mounts that hang; there is no /dev/fuse for this process");
     whole::DaemonProcess daemon(whole::DaemonProcess::Syncs::off, disk.path());
     Session session(daemon, options.verbose);
     Conditions conditions(session);
