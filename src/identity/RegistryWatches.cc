@@ -36,8 +36,11 @@ RegistryWatches::RegistryWatches(const SystemRoot& root)
 
 RegistryWatches::Noticed RegistryWatches::take() {
     Noticed most = Noticed::nothing;
-    if (!inotify_.valid())
-        return most;
+    if (!inotify_.valid()) {
+        // None could be had for want of something: everything is watched and read anew as soon as one can.
+        inotify_.reset(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
+        return inotify_.valid() ? Noticed::registry : most;
+    }
     readInotify(inotify_.get(), [&](const inotify_event& event, std::string_view name) {
         most = std::max(most, judge(event, name));
         followWriters(event, name);

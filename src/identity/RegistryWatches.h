@@ -52,7 +52,7 @@ private:
     void followWriters(const inotify_event& event, std::string_view name);
 
     const SystemRoot& root_;
-    const FileDescriptor inotify_;
+    FileDescriptor inotify_;
     bool complete_ = true;
     std::map<int, Interest> interests_;
     std::map<int, Interest> interestsNew_;

@@ -230,6 +230,7 @@ TEST(Tool, ExitCodesAndOutput) {
         {{"wipe", "a.b", "--class", "data-app", "--yes", "--keep-class"}, 5, "class 1 of the container", "unlock"},
         {{"wipe", "a.b", "--class", "data-app", "--yes"}, 0, "and has 3 now", "'zorvanectl protect' sets it again"},
         {{"lock-state", "0"}, 0, "unlocked"},
+        {{"explain", "1061"}, 0, "No data available"},
         {{"create", "a.b", "--class", "data-app", "--transient"}, 0, "a.b created"},
         {{"--json", "replace", "a.b", "--class", "data-app", "--yes"}, 0, "\"replaced\": true"},
         {{"--json", "delete", "a.b", "--class", "data-app", "--yes"}, 0, "\"deleted\""},

@@ -7,6 +7,10 @@
 #include "zorvane/Error.h"
 
 #include <algorithm>
+#include <charconv>
+#include <cstdint>
+#include <optional>
+#include <string_view>
 
 namespace zorvanectl {
 
@@ -57,6 +61,18 @@ int listPages(const Output& output, const std::vector<Page>& pages) {
     return exitDone;
 }
 
+/// An errno of the system's, as the daemon answers it: plain, or with an offset where it would read as another code.
+std::optional<Page> pageOfErrno(const std::string& text) {
+    std::uint64_t number = 0;
+    const auto [end, failure] = std::from_chars(text.data(), text.data() + text.size(), number);
+    if (failure != std::errc() || end != text.data() + text.size())
+        return std::nullopt;
+    const zorvane::ErrorText found = zorvane::errorText(number);
+    if (std::string_view(found.meaning) == zorvane::errorText(UINT64_MAX).meaning)
+        return std::nullopt;
+    return Page{number, text, found.meaning, found.cause, found.consequence, found.advice};
+}
+
 } // namespace
 
 std::vector<std::pair<std::string, std::string>> explainedCodes() {
@@ -67,9 +83,11 @@ std::vector<std::pair<std::string, std::string>> explainedCodes() {
 }
 
 int explain(const Output& output, const std::string& text) {
-    const std::vector<Page> pages = allPages();
+    std::vector<Page> pages = allPages();
     if (text.empty())
         return listPages(output, pages);
+    if (auto found = pageOfErrno(text))
+        pages.push_back(std::move(*found));
     const auto page = std::ranges::find(pages, text, &Page::name);
     if (page == pages.end())
         return output.localError(exitUsage, "this is no code", "'zorvanectl explain' lists all", "explain " + text);
