@@ -70,7 +70,10 @@ bool Conditions::hold() {
     const auto made = asking->createOrLookup(lateLookup());
     const auto paths = asking->groupContainerPaths(lateUser, lateIdentifier);
     if (!registered || !made || !paths || !paths->contains(lateGroup)) {
-        session_.found("the user with the late home gets no containers");
+        session_.found("the user with the late home gets no containers: " + (!registered ? registered.error().message
+                                                                             : !made     ? made.error().message
+                                                                             : !paths    ? paths.error().message
+                                                                                         : "no group's"));
         return false;
     }
     container_ = made->path;
