@@ -16,8 +16,9 @@ namespace {
 /// A child of the trial needs far less; whoever keeps its pipe open must not hold up the start.
 constexpr int trialMilliseconds = 1000;
 
-/// Becomes this very program, and says so by the end of the pipe whose writing end closes when it does.
-[[noreturn]] void execute() {
+/// Becomes this very program, and says so by the end of the pipe whose writing end closes when it does. Else something
+/// comes through the pipe.
+[[noreturn]] void execute(int writingEnd) {
     const int null = ::open("/dev/null", O_RDWR | O_CLOEXEC);
     for (int standard = 0; standard <= 2; ++standard)
         (void)::dup3(null, standard, 0);
@@ -26,6 +27,7 @@ constexpr int trialMilliseconds = 1000;
     char* const arguments[] = {program, option, nullptr};
     char* const environment[] = {nullptr};
     ::execve(program, arguments, environment);
+    (void)!::write(writingEnd, "x", 1);
     ::_exit(1);
 }
 
@@ -35,7 +37,8 @@ bool ends(int readingEnd) {
     do {
         count = ::poll(&end, 1, trialMilliseconds);
     } while (count < 0 && errno == EINTR);
-    return count > 0;
+    char byte = 0;
+    return count > 0 && ::read(readingEnd, &byte, sizeof byte) == 0;
 }
 
 } // namespace
@@ -76,7 +79,7 @@ bool AddressSpace::isTold() {
             char byte = 0;
             beginWriting.reset();
             (void)!::read(beginReading.get(), &byte, sizeof byte);
-            execute();
+            execute(endWriting.get());
         }
         const std::string path = "/proc/" + std::to_string(child);
         const FileDescriptor process(::open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
@@ -84,8 +87,7 @@ bool AddressSpace::isTold() {
         const bool livedBefore = space.lives();
         endWriting.reset();
         beginWriting.reset();
-        // Another look at the child tells an exec from a mere end.
-        const bool left = ends(endReading.get()) && !space.lives() && opened(process.get()).lives();
+        const bool left = ends(endReading.get()) && !space.lives();
         ::kill(child, SIGKILL);
         ::waitpid(child, nullptr, 0);
         return livedBefore && left;

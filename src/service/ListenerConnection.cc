@@ -16,6 +16,9 @@ namespace {
 
 /// A reply is written into a buffer that its thread keeps, unless it has become larger than most replies ever are.
 constexpr std::size_t replyBufferBytesKept = std::size_t{256} * 1024;
+/// A peer that asks again as soon as it has its answer is served so often before others are looked for. It bounds one
+/// that sends byte by byte, too.
+constexpr unsigned receivesPerTurn = 4;
 
 } // namespace
 
@@ -126,8 +129,7 @@ ListenerConnection::Outcome ListenerConnection::serve(ListenerScratch& scratch, 
             return *outcome;
         if (output_.pendingBytes() >= core_.limits.outputBytesPaused)
             return Outcome::wait;
-        // Also from a peer that sends byte by byte.
-        if (turn.receives++ >= core_.limits.framesPerTurn)
+        if (turn.receives++ >= receivesPerTurn)
             return Outcome::requeue;
         switch (input_.receive(descriptor_, scratch)) {
         case ListenerInput::Received::bytes:

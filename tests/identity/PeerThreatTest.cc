@@ -116,6 +116,7 @@ TEST(PeerThreat, AnAddressSpaceThatOutlivesTheProgram) {
                               {.connects = PeerStart::Connects::no, .prepare = share, .runs = self});
     const FileDescriptor accepted = world.server.accept();
     const auto peer = world.identity.peerOfSocket(accepted.get());
+    EXPECT_TRUE(AddressSpace::isTold()) << "every message of a peer costs a look at its executable";
     EXPECT_EQ(who(*peer), "self");
     ASSERT_EQ(::write(writing.get(), "x", 1), 1);
     EXPECT_TRUE(eventually([&] { return who(*peer) == "-"; }));
