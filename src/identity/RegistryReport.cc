@@ -2,6 +2,7 @@
 #include "identity/RegistryReport.h"
 
 #include "base/EntitlementKeys.h"
+#include "base/Format.h"
 #include "identity/IdentityRegistry.h"
 #include "os/Names.h"
 #include "os/Openat2.h"
@@ -117,8 +118,9 @@ RegistryReport reportRegistry(const SystemRoot& root, uid_t daemonUserId) {
     const auto names = directoryNames(listing.directory.get());
     for (const std::string& name : names ? *names : std::vector<std::string>())
         if (!listing.files.contains(name))
-            report.files.push_back(ignored(name, std::string("its name does not end in ") + names::identityFileSuffix +
-                                                     ", or begins with a dot, or too many files come before it"));
+            report.files.push_back(ignored(
+                name, formatted("its name does not end in %s, or begins with a dot, or too many files come before it",
+                                names::identityFileSuffix)));
     return report;
 }
 
