@@ -22,7 +22,7 @@ using Frame = std::vector<std::uint8_t>;
 constexpr std::uint32_t userId = 501;
 /// The user of a class's containers here.
 [[nodiscard]] constexpr std::uint32_t userOf(ContainerClass containerClass) {
-    return isBundleClass(containerClass) ? bundleOwnerUserId : userId;
+    return isBundleClass(containerClass) ? ipc::UserNumbers().installer : userId;
 }
 
 /// A whole frame of a request.

@@ -184,13 +184,6 @@ std::string_view containerClassName(std::uint64_t number) {
     return ipc::containerClassNames[ipc::isContainerClass(number) ? number : 0];
 }
 
-std::uint32_t defaultUserOfClass(std::uint64_t number) {
-    const auto containerClass = static_cast<ipc::ContainerClass>(number);
-    if (ipc::isBundleClass(containerClass))
-        return ipc::bundleUserId;
-    return ipc::isSystemClass(containerClass) ? ipc::systemUserId : currentMobileUser;
-}
-
 std::string uuidText(const std::array<std::uint8_t, 16>& uuid) {
     return ipc::uuidText(uuid);
 }

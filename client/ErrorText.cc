@@ -109,11 +109,12 @@ constexpr Row rows[] = {
     {38,
      {"this user, key, class or data-protection class is not allowed here",
       "the request asks for what no client, or not this one, may have", "nothing was changed",
-      "for a user: bundles belong to user 33, system containers to 499, all others to 501 to 510, and a mobile user "
-      "acts "
-      "only as itself; for data protection: name class 0, 1 or 3; for a new container: a mobile user has 100000 at "
-      "most, "
-      "unless zorvaned is started with another number"}},
+      "for a user: bundles and system containers belong to one user each, all others to the users from first= to last= "
+      "in section [users] of /etc/zorvane/zorvaned.conf (33, 499, 501 to 510 unless it says otherwise), and a mobile "
+      "user "
+      "acts only as itself; for data protection: name class 0, 1 or 3; for a new container: a mobile user has 100000 "
+      "at "
+      "most, unless zorvaned is started with another number"}},
     {40,
      {"the daemon caught an exception", "memory ran out, or the daemon has a fault",
       "the operation was given up; a replace was undone as far as it could be", "report it with the daemon's log"}},

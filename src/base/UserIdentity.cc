@@ -5,27 +5,17 @@
 
 namespace zor {
 
-bool userIdIsValidForClass(ContainerClass containerClass, std::uint32_t userId) {
-    if (isBundleClass(containerClass))
-        return userId == bundleOwnerUserId;
-    if (isSystemClass(containerClass))
-        return userId == systemOwnerUserId;
-    if (isPerUserClass(containerClass))
-        return userId >= firstMobileUserId && userId <= lastMobileUserId;
-    return false;
-}
-
 Result<std::uint32_t> UserIdentity::validateUserId(std::uint32_t requested, ContainerClass containerClass,
                                                    std::uint32_t clientUserId) {
     if (isBundleClass(containerClass) || isSystemClass(containerClass)) {
-        if (userIdIsValidForClass(containerClass, requested))
+        if (numbers_.mayOwn(containerClass, requested))
             return requested;
-    } else if (clientUserId <= lastSystemClientUserId) {
-        if (requested == currentUserPlaceholder)
+    } else if (clientUserId <= numbers_.lastSystemClient()) {
+        if (requested == ipc::currentMobileUser)
             return getCurrentMobileUserId();
-        if (userIdIsValidForClass(containerClass, requested))
+        if (numbers_.mayOwn(containerClass, requested))
             return requested;
-    } else if (requested == currentUserPlaceholder || requested == clientUserId) {
+    } else if (requested == ipc::currentMobileUser || requested == clientUserId) {
         return clientUserId;
     }
     const std::string text = formatted("Invalid userId %u for class %llu from client %u", requested,

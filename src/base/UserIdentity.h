@@ -6,7 +6,7 @@
 #include "base/ContainerClass.h"
 #include "base/Mutex.h"
 #include "base/Result.h"
-#include "base/UserNumbers.h"
+#include "ipc/UserNumbers.h"
 #include "platform/Device.h"
 
 #include <atomic>
@@ -14,17 +14,12 @@
 
 namespace zor {
 
-/// The user id in a request that stands for the current mobile user. Never stored as an owner.
-inline constexpr std::uint32_t currentUserPlaceholder = 1;
-inline constexpr std::uint32_t bundleOwnerUserId = 33;
-inline constexpr std::uint32_t systemOwnerUserId = 499;
-
-/// Whether `userId` may own containers of the class. Classes outside 1 to 13 have no owner.
-[[nodiscard]] bool userIdIsValidForClass(ContainerClass containerClass, std::uint32_t userId);
+using ipc::UserNumbers;
 
 class UserIdentity {
 public:
-    UserIdentity(const Log& log, const platform::PasswordDatabase& passwords) : log_(log), passwords_(passwords) {}
+    UserIdentity(const Log& log, const platform::PasswordDatabase& passwords, const UserNumbers& numbers)
+        : log_(log), passwords_(passwords), numbers_(numbers) {}
 
     /// The user that a request acts on, or error 38 (logged). `requested` is the low 32 bits of what the client sent.
     [[nodiscard]] Result<std::uint32_t> validateUserId(std::uint32_t requested, ContainerClass containerClass,
@@ -36,6 +31,7 @@ public:
 private:
     const Log& log_;
     const platform::PasswordDatabase& passwords_;
+    const UserNumbers numbers_;
     platform::Mutex lookup_; // held while the database is asked
     bool saidMissing_ ZOR_GUARDED_BY(lookup_) = false;
     static constexpr std::int64_t notLookedUp = -1;

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "check/CheckedSystem.h"
 
+#include "identity/UserConfiguration.h"
 #include "os/DaemonLock.h"
 
 #include <cerrno>
@@ -23,10 +24,14 @@ std::expected<std::unique_ptr<CheckedSystem>, std::string> CheckedSystem::open(c
     // Without it nothing has run there since the boot.
     if (const int failure = root->openRuntimeDirectory(); failure != 0 && failure != ENOENT)
         return std::unexpected("cannot open the daemon's runtime directory: " + std::string(errorText(failure)));
-    return std::unique_ptr<CheckedSystem>(new CheckedSystem(std::move(*root)));
+    auto configured = platform::configuredUsers(*root, platform::LinuxPasswordDatabase(*root));
+    if (!configured)
+        return std::unexpected(std::move(configured).error());
+    return std::unique_ptr<CheckedSystem>(new CheckedSystem(std::move(*root), std::move(*configured)));
 }
 
-CheckedSystem::CheckedSystem(platform::SystemRoot root) : root_(std::move(root)) {
+CheckedSystem::CheckedSystem(platform::SystemRoot root, ipc::ConfiguredUsers configured)
+    : root_(std::move(root)), configured_(std::move(configured)) {
     places_.fenceMounts(fileManager_);
 }
 

@@ -8,6 +8,7 @@
 #include "device/XattrProtectionClass.h"
 #include "fs/ZORFileManager.h"
 #include "identity/LinuxPasswordDatabase.h"
+#include "ipc/UserNumbers.h"
 #include "os/Openat2.h"
 #include "os/SystemRoot.h"
 #include "platform/Disk.h"
@@ -18,6 +19,7 @@
 #include <expected>
 #include <memory>
 #include <string>
+#include <vector>
 
 namespace zor::check {
 
@@ -74,6 +76,9 @@ public:
 
     [[nodiscard]] const platform::SystemRoot& root() const { return root_; }
     [[nodiscard]] const platform::PasswordDatabase& passwords() const { return passwords_; }
+    /// Who owns containers here, as a daemon would read it.
+    [[nodiscard]] const ipc::UserNumbers& users() const { return configured_.numbers; }
+    [[nodiscard]] const std::vector<std::string>& userDoubts() const { return configured_.doubts; }
     [[nodiscard]] const platform::BootMarker& bootMarker() const { return bootMarker_; }
     [[nodiscard]] const platform::FileProtectionClass& protection() const { return protection_; }
     [[nodiscard]] const Log& log() const { return log_; }
@@ -87,9 +92,10 @@ public:
     [[nodiscard]] std::string belowRoot(const FileURL& url) const;
 
 private:
-    explicit CheckedSystem(platform::SystemRoot root);
+    CheckedSystem(platform::SystemRoot root, ipc::ConfiguredUsers configured);
 
     platform::SystemRoot root_;
+    const ipc::ConfiguredUsers configured_;
     ReadOnlyDisk disk_;
     SilentLog silence_;
     Log log_{silence_};

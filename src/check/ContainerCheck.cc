@@ -78,9 +78,9 @@ void ContainerCheck::checkAll() {
     for (std::uint64_t number = 1; ipc::isContainerClass(number); ++number) {
         const ContainerClass containerClass = classes(number);
         if (isBundleClass(containerClass))
-            checkClass(containerClass, bundleOwnerUserId, std::nullopt);
+            checkClass(containerClass, look_.device().users().installer, std::nullopt);
         else if (isSystemClass(containerClass))
-            checkClass(containerClass, systemOwnerUserId, std::nullopt);
+            checkClass(containerClass, look_.device().users().system, std::nullopt);
         else
             for (const MobileUser& user : look_.users())
                 checkClass(containerClass, user.userId, user.home);
@@ -253,14 +253,14 @@ void ContainerCheck::addRefused(const ClassDirectory& directory, const char* nam
 
 std::optional<FileURL> ContainerCheck::rightPlace(const ClassDirectory& directory, const char* name) const {
     std::vector<MobileUser> owners = look_.users();
-    owners.push_back({bundleOwnerUserId, {}});
-    owners.push_back({systemOwnerUserId, {}});
+    owners.push_back({look_.device().users().installer, {}});
+    owners.push_back({look_.device().users().system, {}});
     const auto parent = std::make_shared<const std::string>(directory.url.path());
     for (const auto& [userId, home] : owners) {
         const MetadataReader reader(look_.device().fileManager().disk(), directory.descriptor, parent, userId,
                                     CheckClassPath::no);
         const auto record = reader.read(name);
-        if (!record || !userIdIsValidForClass((*record)->containerClass(), userId))
+        if (!record || !look_.device().users().mayOwn((*record)->containerClass(), userId))
             continue;
         const auto base = look_.device().places().baseOfClass((*record)->containerClass(), directory.transient,
                                                               home.empty() ? std::nullopt : std::optional(home));

@@ -42,9 +42,11 @@ enum class FindingCode : std::uint8_t {
     entitlementsAside,
     bootMarkerForeign,
     bootMarkerMissing,
+    rootIncomplete,
+    userNumberTaken,
     unexamined,
 };
-inline constexpr std::size_t findingCodeCount = 26;
+inline constexpr std::size_t findingCodeCount = 28;
 
 /// The one who puts it right.
 enum class Mender : std::uint8_t {

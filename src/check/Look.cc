@@ -15,7 +15,7 @@ namespace zor::check {
 
 Look::Look(CheckedSystem& system, const CheckOptions& options)
     : system_(system), options_(options), whitelist_(ZORWhitelist::forSystem(system.log(), system.fileManager())) {
-    for (std::uint32_t userId = firstMobileUserId; userId <= lastMobileUserId; ++userId)
+    for (std::uint32_t userId = system_.users().first; userId <= system_.users().last; ++userId)
         addUser(userId);
 }
 

@@ -70,7 +70,7 @@ void ReferenceCheck::checkGroups(const plist::Dictionary& map, bool system) {
 }
 
 void ReferenceCheck::checkSystemContainers(const plist::Dictionary& map) {
-    const auto found = look_.sharedContainers.find({ContainerClass::dataSystem, systemOwnerUserId});
+    const auto found = look_.sharedContainers.find({ContainerClass::dataSystem, look_.device().users().system});
     if (found == look_.sharedContainers.end())
         return;
     for (const auto& [identifier, url] : found->second) {
@@ -79,7 +79,7 @@ void ReferenceCheck::checkSystemContainers(const plist::Dictionary& map) {
         Finding& finding = look_.add(FindingCode::systemUnentitled, url,
                                      "belongs to an identifier that is not entitled to it", Mender::boot);
         finding.containerClass = ContainerClass::dataSystem;
-        finding.user = systemOwnerUserId;
+        finding.user = look_.device().users().system;
         finding.identifier = identifier;
     }
 }

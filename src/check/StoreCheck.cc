@@ -5,6 +5,8 @@
 #include "check/Look.h"
 #include "check/ReferenceCheck.h"
 #include "check/WorkCheck.h"
+#include "os/Names.h"
+#include "store/RootNeeds.h"
 
 #include <algorithm>
 #include <thread>
@@ -13,8 +15,21 @@ namespace zor::check {
 
 namespace {
 
+/// What the whole system lacks or has too much of.
+void checkSystem(Look& look) {
+    const CheckedSystem& system = look.device();
+    for (const std::string& path : missingOf(system.root()))
+        look.addForPerson(FindingCode::rootIncomplete, FileURL::file(system.root().path(path)), "is not there",
+                          initCommand(system.root()));
+    for (const std::string& doubt : system.userDoubts())
+        look.addForPerson(FindingCode::userNumberTaken,
+                          FileURL::file(system.root().path(platform::names::configurationFile)), doubt,
+                          "man zorvaned.conf");
+}
+
 std::vector<Finding> lookOnce(CheckedSystem& system, const CheckOptions& options) {
     Look look(system, options);
+    checkSystem(look);
     ContainerCheck(look).checkAll();
     ReferenceCheck(look).checkAll();
     WorkCheck(look).checkAll();

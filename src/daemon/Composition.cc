@@ -5,18 +5,19 @@ namespace zor {
 
 Composition::Composition(platform::Platform platform, fs::Durability::Probe probe)
     : platform_(platform), log_(platform.log),
-      refusals_([this](uid_t uid, std::uint64_t linesLeftOut) { sayLeftOut(uid, linesLeftOut); },
-                [this](std::chrono::milliseconds delay) { refusalsEnd_.set(delay); }),
+      refusals_(
+          platform.users, [this](uid_t uid, std::uint64_t linesLeftOut) { sayLeftOut(uid, linesLeftOut); },
+          [this](std::chrono::milliseconds delay) { refusalsEnd_.set(delay); }),
       refusalsEnd_(platform.runLoop, [this] { refusals_.reportEnded(); }),
-      boundary_(log_, platform.internalBuild, platform.crash), users_(log_, platform.passwords), locks_(log_),
-      fileManager_(log_, platform.root, platform.disk, platform.protection), durability_(platform.disk, probe),
-      configuration_(log_, fileManager_, platform.passwords),
+      boundary_(log_, platform.internalBuild, platform.crash), users_(log_, platform.passwords, platform.users),
+      locks_(log_), fileManager_(log_, platform.root, platform.disk, platform.protection),
+      durability_(platform.disk, probe), configuration_(log_, fileManager_, platform.passwords, platform.users),
       cache_(log_, fileManager_, configuration_, durability_, boundary_) {
     log_.limitRefusals([this](std::uint32_t uid, std::size_t bytes) { return refusals_.admit(uid, bytes); });
 }
 
 void Composition::sayLeftOut(uid_t uid, std::uint64_t lines) const {
-    const std::string whose = uid == strangersUserId ? "users that are not known" : "user " + std::to_string(uid);
+    const std::string whose = uid == ipc::strangersUserId ? "users that are not known" : "user " + std::to_string(uid);
     log_.write(logLevelNotice, "RefusalLimiter", "Left out %llu refusals of %s", static_cast<unsigned long long>(lines),
                whose.c_str());
 }

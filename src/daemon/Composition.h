@@ -8,7 +8,6 @@
 
 #include "base/Log.h"
 #include "base/UserIdentity.h"
-#include "base/UserNumbers.h"
 #include "base/ZORException.h"
 #include "base/ZORLocks.h"
 #include "daemon/Dispatcher.h"

@@ -1,6 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/LinuxPlatform.h"
 
+#include "fs/AtomicFile.h"
+#include "identity/UserConfiguration.h"
 #include "os/Names.h"
 
 #include <cerrno>
@@ -12,6 +14,8 @@ namespace zor::platform {
 namespace {
 
 constexpr int levelError = 3;
+/// Clients of every user read it.
+constexpr mode_t usersFileMode = 0644;
 constexpr const char* deathRowLabel = "com.veltra.zorvaned.deathrow";
 constexpr const char* lockStateLabel = "com.veltra.zorvaned.lockstate";
 
@@ -40,13 +44,22 @@ std::expected<std::unique_ptr<LinuxPlatform>, std::string> LinuxPlatform::open(O
         return std::unexpected("another daemon serves the root " + root->canonicalPath());
     if (!lock)
         return cannot("cannot lock " + runtime + "/" + names::lockFile, lock.error());
-    return std::unique_ptr<LinuxPlatform>(new LinuxPlatform(std::move(*root), std::move(*lock), std::move(options)));
+    auto users = configuredUsers(*root, LinuxPasswordDatabase(*root));
+    if (!users)
+        return std::unexpected(std::move(users).error());
+    const std::string numbers = ipc::textOf(users->numbers);
+    if (const int failed =
+            fs::replaceFileDurably(disk, root->runtimeDirectory(), names::usersFile, usersFileMode,
+                                   {reinterpret_cast<const std::uint8_t*>(numbers.data()), numbers.size()}))
+        return cannot("cannot write " + runtime + "/" + names::usersFile, -failed);
+    return std::unique_ptr<LinuxPlatform>(
+        new LinuxPlatform(std::move(*root), std::move(*lock), std::move(*users), std::move(options)));
 }
 
-LinuxPlatform::LinuxPlatform(SystemRoot root, DaemonLock lock, Options options)
-    : root_(std::move(root)), lock_(std::move(lock)), passed_(std::move(options.passed)), disk_(options.syncs),
-      log_(options.foreground), registry_(root_, log_, ::geteuid()), peers_(registry_, ::geteuid()),
-      upcallPort_(root_, peers_, passed_.take(names::passedUpcallSocket)),
+LinuxPlatform::LinuxPlatform(SystemRoot root, DaemonLock lock, ipc::ConfiguredUsers users, Options options)
+    : root_(std::move(root)), lock_(std::move(lock)), users_(std::move(users)), passed_(std::move(options.passed)),
+      disk_(options.syncs), log_(options.foreground), registry_(root_, log_, ::geteuid()),
+      peers_(registry_, ::geteuid()), upcallPort_(root_, peers_, passed_.take(names::passedUpcallSocket)),
       listener_(peers_, listenerOptions(options.listenerLimits)),
       deathRowQueue_(deathRowLabel, WorkQueue::Priority::background), lockStateQueue_(lockStateLabel) {
     // Where the loop cannot follow it, the registry looks for itself.
@@ -70,13 +83,14 @@ ListenerOptions LinuxPlatform::listenerOptions(const ListenerLimits& limits) {
                        .directoryPath = root_.path(names::runtimeDirectory),
                        .name = names::serviceSocket};
     options.passed = passed_.take(names::passedServiceSocket);
-    options.limits = limits;
+    options.limits = limits.forUsers(users_.numbers);
     options.report = [this](std::string_view line) { log_.write(levelError, "ServiceListener", line); };
     return options;
 }
 
 Platform LinuxPlatform::roles() {
     return {.root = root_,
+            .users = users_.numbers,
             .disk = disk_,
             .log = log_,
             .internalBuild = internalBuild_,

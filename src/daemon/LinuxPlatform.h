@@ -15,6 +15,7 @@
 #include "identity/IdentityRegistry.h"
 #include "identity/LinuxPasswordDatabase.h"
 #include "identity/LinuxPeerIdentity.h"
+#include "ipc/UserNumbers.h"
 #include "os/DaemonLock.h"
 #include "os/EpollRunLoop.h"
 #include "os/LinuxDisk.h"
@@ -43,8 +44,8 @@ public:
         ListenerLimits listenerLimits;
     };
 
-    /// Opens the root, makes the runtime directory and takes the daemon's lock; nothing is served yet. Else one line
-    /// that says what stood in the way.
+    /// Opens the root, makes the runtime directory, takes the daemon's lock, reads who owns containers and tells
+    /// clients; nothing is served yet. Else one line that says what stood in the way.
     [[nodiscard]] static std::expected<std::unique_ptr<LinuxPlatform>, std::string> open(Options options);
     ~LinuxPlatform();
     LinuxPlatform(const LinuxPlatform&) = delete;
@@ -53,6 +54,7 @@ public:
     [[nodiscard]] Platform roles();
 
     [[nodiscard]] const SystemRoot& root() const { return root_; }
+    [[nodiscard]] const ipc::ConfiguredUsers& users() const { return users_; }
     [[nodiscard]] EpollRunLoop& runLoop() { return runLoop_; }
     [[nodiscard]] LinuxServiceListener& listener() { return listener_; }
     [[nodiscard]] LinuxPeerIdentity& peers() { return peers_; }
@@ -65,11 +67,12 @@ public:
     void finish();
 
 private:
-    LinuxPlatform(SystemRoot root, DaemonLock lock, Options options);
+    LinuxPlatform(SystemRoot root, DaemonLock lock, ipc::ConfiguredUsers users, Options options);
     [[nodiscard]] ListenerOptions listenerOptions(const ListenerLimits& limits);
 
     SystemRoot root_;
     DaemonLock lock_;
+    const ipc::ConfiguredUsers users_;
     PassedSockets passed_;
     LinuxDisk disk_;
     RotatingLog log_;

@@ -1,8 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/RefusalLimiter.h"
 
-#include "base/UserNumbers.h"
-
 #include <algorithm>
 #include <utility>
 
@@ -13,8 +11,9 @@ constexpr std::chrono::seconds second{1};
 constexpr std::chrono::minutes minute{1};
 } // namespace
 
-RefusalLimiter::RefusalLimiter(Report report, Later later, std::function<Clock::time_point()> now)
-    : report_(std::move(report)), later_(std::move(later)), now_(std::move(now)) {}
+RefusalLimiter::RefusalLimiter(const ipc::UserNumbers& users, Report report, Later later,
+                               std::function<Clock::time_point()> now)
+    : users_(users), report_(std::move(report)), later_(std::move(later)), now_(std::move(now)) {}
 
 bool RefusalLimiter::admit(uid_t uid, std::size_t bytes) {
     Outcome outcome;
@@ -23,7 +22,7 @@ bool RefusalLimiter::admit(uid_t uid, std::size_t bytes) {
         const MutexLock lock(mutex_);
         const Clock::time_point now = now_();
         collectEnded(now, outcome);
-        Slot& slot = slotOf(countedUserId(uid), now, outcome);
+        Slot& slot = slotOf(users_.counted(uid), now, outcome);
         slot.lastSeen = now;
         if (now - slot.lines.begun >= second)
             slot.lines = {.begun = now};

@@ -8,6 +8,7 @@
 #pragma once
 
 #include "base/Mutex.h"
+#include "ipc/UserNumbers.h"
 
 #include <array>
 #include <chrono>
@@ -21,7 +22,7 @@ namespace zor::platform {
 class RefusalLimiter {
 public:
     using Clock = std::chrono::steady_clock;
-    /// Told how many lines of one user, or of strangersUserId, were left out. Called without any lock held.
+    /// Told how many lines of one user, or of ipc::strangersUserId, were left out. Called without any lock held.
     using Report = std::function<void(uid_t uid, std::uint64_t linesLeftOut)>;
     /// Has reportEnded called after that time, or earlier. Called without any lock held.
     using Later = std::function<void(std::chrono::milliseconds delay)>;
@@ -31,7 +32,8 @@ public:
     static constexpr std::size_t bytesPerMinuteMax = 20 * 1024;
     static constexpr std::size_t usersMax = 64;
 
-    RefusalLimiter(Report report, Later later, std::function<Clock::time_point()> now = Clock::now);
+    RefusalLimiter(const ipc::UserNumbers& users, Report report, Later later,
+                   std::function<Clock::time_point()> now = Clock::now);
 
     /// Whether a line about `uid` is to be written now, which takes so many bytes in the log.
     [[nodiscard]] bool admit(uid_t uid, std::size_t bytes);
@@ -72,6 +74,7 @@ private:
     static void take(Slot& slot, Outcome& outcome);
     void act(const Outcome& outcome) const;
 
+    const ipc::UserNumbers users_;
     const Report report_;
     const Later later_;
     const std::function<Clock::time_point()> now_;

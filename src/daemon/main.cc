@@ -5,11 +5,13 @@
 #include "daemon/LinuxPlatform.h"
 #include "daemon/Options.h"
 #include "daemon/Status.h"
+#include "daemon/Watchdog.h"
 #include "os/EpollRunLoop.h"
 #include "os/FileDescriptor.h"
 #include "os/Names.h"
 #include "os/NotifySocket.h"
 #include "service/StatusSocket.h"
+#include "store/RootNeeds.h"
 
 #include <atomic>
 #include <csignal>
@@ -32,7 +34,7 @@ constexpr int mallocArenas = 2;
 
 /// Told to the service manager while the setup goes on: it waits this long, in microseconds, for the next word.
 /// One item, perhaps a large tree that an old system left on another file system, may take minutes.
-constexpr std::string_view setupGoesOn = "EXTEND_TIMEOUT_USEC=600000000";
+constexpr std::string_view setupGoesOn = "EXTEND_TIMEOUT_USEC=600000000\nSTATUS=Putting in order what lies on the disk";
 
 /// False when a standard descriptor is missing and stays so: its number would be some container's or client's.
 [[nodiscard]] bool prepareProcess() {
@@ -119,6 +121,18 @@ void addPlatformCounters(platform::LinuxPlatform& platform, plist::Dictionary& c
     counters.set("BufferedOutputBytes", listener.outputBytes);
     counters.set("ListenerThreads", listener.threads);
     counters.set("ListenerThreadsMost", listener.threadsMost);
+    const auto& [numbers, doubts] = platform.users();
+    counters.set("Users", plist::Dictionary{{"Installer", numbers.installer},
+                                            {"System", numbers.system},
+                                            {"First", numbers.first},
+                                            {"Last", numbers.last},
+                                            {"Doubts", plist::Array(doubts.begin(), doubts.end())}});
+}
+
+/// What the service manager shows of the daemon.
+std::string shortStatus(const platform::SystemRoot& root, const platform::ListenerCounters& counters) {
+    return "Serving " + root.canonicalPath() + ": " + std::to_string(counters.messages) + " requests so far, " +
+           std::to_string(counters.connections) + " connections";
 }
 
 /// The status is a help, not a service: without it the daemon goes on, and says so.
@@ -159,12 +173,18 @@ int main(int argumentCount, char** arguments) {
         std::fprintf(stderr, "zorvaned: %s\n", platform.error().c_str());
         return 1;
     }
+    if (const auto missing = missingOf((*platform)->root()); !missing.empty()) {
+        std::fprintf(stderr, "zorvaned: %s\n", lineAboutMissing((*platform)->root(), missing).c_str());
+        return 1;
+    }
     if (options->forgetBoot)
         (*platform)->bootMarker().forget();
 
     StopOnSignal stop(**platform);
     Composition composition((*platform)->roles());
     const auto notify = platform::NotifySocket::ofEnvironment();
+    Watchdog watchdog((*platform)->runLoop(), notify, [&] { return (*platform)->listener().answers(); },
+                      [&] { return shortStatus((*platform)->root(), (*platform)->listener().counters()); });
     Status status(composition, [&](plist::Dictionary& counters) {
         addPlatformCounters(**platform, counters);
         counters.set("LogLinesLost", (*platform)->log().linesLost() + composition.log().linesLost());
@@ -177,13 +197,19 @@ int main(int argumentCount, char** arguments) {
                                 .beforeClients =
                                     [&] {
                                         sayIfConnectionsAreFew(limits, descriptorsMax, composition.log());
+                                        for (const std::string& doubt : (*platform)->users().doubts)
+                                            composition.log().writeText(logLevelError, "main", doubt);
                                         openStatus(**platform, statusSocket, composition.log());
                                     },
-                                .ready = [&] { (void)notify.send("READY=1"); },
+                                .ready =
+                                    [&] {
+                                        (void)notify.send("READY=1");
+                                        watchdog.start(platform::NotifySocket::watchdogOfEnvironment());
+                                    },
                                 .settingUp = [&] { (void)notify.send(setupGoesOn); },
                                 .stopWanted = [&] { return stop.isWanted(); }});
     const int exitStatus = daemon.run();
-    (void)notify.send("STOPPING=1");
+    (void)notify.send("STOPPING=1\nSTATUS=Ending what is under way");
     statusSocket.close();
     (*platform)->finish();
     return exitStatus;

@@ -62,10 +62,4 @@ static_assert(containerClassNames.size() == static_cast<std::size_t>(ContainerCl
     return containerClass == ContainerClass::dataSystem || containerClass == ContainerClass::sharedSystemGroup;
 }
 
-// The users that own containers.
-inline constexpr std::uint64_t bundleUserId = 33;
-inline constexpr std::uint64_t systemUserId = 499;
-/// In a request: the current mobile user, whoever that is.
-inline constexpr std::uint64_t currentMobileUser = 1;
-
 } // namespace zor::ipc

@@ -14,6 +14,8 @@ inline constexpr std::string_view statusSocketName = "zorvaned.status";
 inline constexpr std::string_view runtimeDirectory = "run/zorvane";
 /// In it: a locked file for each program that must not be started now, named by its percent-encoded identifier.
 inline constexpr std::string_view assertionDirectory = "assertions";
+/// In it: the numbers of the users that own containers, as the daemon serves them.
+inline constexpr std::string_view usersFile = "users";
 /// In it: whether the device is locked.
 inline constexpr std::string_view lockStateFile = "lockstate";
 

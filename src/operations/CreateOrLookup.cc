@@ -69,7 +69,7 @@ Result<void> ZORClientConnection::checkRequest(std::uint32_t userId, const std::
         return makeError(log, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
                          "Can't act on an invalid object: userId: %u, ID: %s, class: %ld", userId,
                          ZOR_SHOWN(identifier), classNumber);
-    if (!userIdIsValidForClass(containerClass, userId))
+    if (!services_.configuration.users().mayOwn(containerClass, userId))
         return makeError(log, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
                          "Invalid userId %u for class %ld, ID: %s", userId, classNumber, ZOR_SHOWN(*identifier));
     if (containerClass == ContainerClass::dataSystem && !allowOtherIdLookup() &&

@@ -26,7 +26,7 @@ constexpr std::array formerGroupHolders = {ContainerClass::dataApplication, Cont
 
 /// One with an account whose home is not there, or cannot be looked for.
 std::optional<std::uint32_t> userWithoutHome(const ZORGlobalConfiguration& configuration) {
-    for (std::uint32_t userId = firstMobileUserId; userId <= lastMobileUserId; ++userId) {
+    for (std::uint32_t userId = configuration.users().first; userId <= configuration.users().last; ++userId) {
         const auto state = configuration.homeOf(userId)->look().state;
         if (state == UserHome::State::missing || state == UserHome::State::unknown)
             return userId;
@@ -46,11 +46,11 @@ std::uint64_t ZOREntitlementMapping::migrateAppGroupIdsFromDataContainersToFile(
     log_.write(logLevelNotice, migrateFunction, "Performing group ID migration");
     std::vector<ZORContainerCache::Record> containers;
     for (const ContainerClass containerClass : formerGroupHolders) {
-        const auto records = services_.cache.allContainersForUser(firstMobileUserId, containerClass, false);
+        const auto records = services_.cache.allContainersForUser(configuration_.users().first, containerClass, false);
         if (!records) {
             log_.write(logLevelError, migrateFunction,
-                       "Failed to fetch list of containers for userId: %u, class %ld : %s", firstMobileUserId,
-                       static_cast<long>(containerClass), records.error().text().c_str());
+                       "Failed to fetch list of containers for userId: %u, class %ld : %s",
+                       configuration_.users().first, static_cast<long>(containerClass), records.error().text().c_str());
             return 0;
         }
         containers.insert(containers.end(), records->begin(), records->end());
@@ -87,7 +87,7 @@ bool ZOREntitlementMapping::groupIdsAreMigrated() {
     if (groupIdsAreMigrated_ || services_.migrator.existsMigrationFileWithName(names::groupIdMigrationMarker))
         return true;
     // Where that user is not, the lists can never be fetched, and there is never a marker.
-    return configuration_.homeOf(firstMobileUserId)->look().state == UserHome::State::noAccount;
+    return configuration_.homeOf(configuration_.users().first)->look().state == UserHome::State::noAccount;
 }
 
 bool ZOREntitlementMapping::migrateGroupIdentifiers(const ZORMetadata& container) {
@@ -95,7 +95,7 @@ bool ZOREntitlementMapping::migrateGroupIdentifiers(const ZORMetadata& container
     const plist::Value groups = *groupIdentifiersIn(container);
     const plist::Dictionary migrated{{std::string(entitlementKeys::applicationGroups), groups}};
     ZOR_LOG(log_, logLevelDebug, "Data container for userId: %u, identifier %s references container IDs: %s",
-            firstMobileUserId, ZOR_SHOWN(identifier), plist::describe(&groups).c_str());
+            configuration_.users().first, ZOR_SHOWN(identifier), plist::describe(&groups).c_str());
     // Whoever registered meanwhile did so under this system: what it said stays, and the older list is added.
     const auto stored = [&] {
         const platform::MutexLock held(entitlementQueue_);
@@ -111,7 +111,7 @@ bool ZOREntitlementMapping::migrateGroupIdentifiers(const ZORMetadata& container
     const std::string path = container.url().path();
     const std::string key(ipc::infoKeys::groupContainerIds);
     const auto cleared = services_.sharedClientConnection->setInfoValue(nullptr, &key,
-                                                                        {.userId = firstMobileUserId,
+                                                                        {.userId = configuration_.users().first,
                                                                          .uuid = container.uuid(),
                                                                          .identifier = identifier,
                                                                          .containerClass = container.containerClass()},
@@ -145,7 +145,8 @@ std::uint64_t ZOREntitlementMapping::reconcileSystemContainers() {
     const auto owners = ownersOfSystemContainers();
     if (!owners)
         return 0;
-    const auto containers = services_.cache.allContainersForUser(systemOwnerUserId, ContainerClass::dataSystem, false);
+    const auto containers =
+        services_.cache.allContainersForUser(configuration_.users().system, ContainerClass::dataSystem, false);
     if (!containers) {
         log_.write(logLevelError, reconcileFunction, "Failed to fetch system container list: %s",
                    containers.error().text().c_str());
@@ -161,7 +162,7 @@ std::uint64_t ZOREntitlementMapping::reconcileSystemContainers() {
         log_.write(logLevelError, reconcileFunction, "Removing system container with identifier %s",
                    ZOR_SHOWN(identifier));
         const auto staged = services_.sharedClientConnection->stageForDeleteContainersWithUsers(
-            ZORClientConnection::DeletionBatch::of(systemOwnerUserId, container->uuid(), identifier,
+            ZORClientConnection::DeletionBatch::of(configuration_.users().system, container->uuid(), identifier,
                                                    ContainerClass::dataSystem),
             UseLocking::yes);
         if (staged)

@@ -63,7 +63,7 @@ void ZORClientConnection::rebootContainerManagerSetup() {
         std::uint64_t moved =
             discardAtBoot(services_.configuration.transientDirectory(), "shared transient", std::nullopt);
         moved += discardAtBoot(services_.configuration.transientBundleDirectory(), "shared transient bundle",
-                               bundleOwnerUserId);
+                               services_.configuration.users().installer);
         return moved;
     });
     report.run("group identifiers of data containers",
@@ -76,8 +76,10 @@ void ZORClientConnection::rebootContainerManagerSetup() {
     report.run("orphans of the system", [this] {
         std::uint64_t removed = 0;
         forEachClass(isSharedClass, [&](ContainerClass containerClass) {
-            removed += _cleanupOrphanedDataForUser(
-                isBundleClass(containerClass) ? bundleOwnerUserId : systemOwnerUserId, containerClass);
+            removed +=
+                _cleanupOrphanedDataForUser(isBundleClass(containerClass) ? services_.configuration.users().installer
+                                                                          : services_.configuration.users().system,
+                                            containerClass);
         });
         return removed;
     });
@@ -123,7 +125,8 @@ void ZORClientConnection::discardCopyLeftovers(const FileURL& directory) {
 
 std::uint64_t ZORClientConnection::cleanUpUsers() {
     std::uint64_t removed = 0;
-    for (std::uint32_t userId = firstMobileUserId; userId <= lastMobileUserId; ++userId) {
+    for (std::uint32_t userId = services_.configuration.users().first; userId <= services_.configuration.users().last;
+         ++userId) {
         ZORPerUserConfiguration* user = services_.configuration.getPerUserConfigurationForUserId(userId);
         if (!user || !user->existsUserBaseDirectory())
             continue;

@@ -103,8 +103,9 @@ ZORContainerMigrator::Outcome ZORContainerMigrator::performMigrationWithError() 
         adoptBundlesOfClass(containerClass, count);
     log.write(logLevelNotice, migrationFunction, "Changing ownership of bundle container content. %llu errors so far",
               static_cast<unsigned long long>(count.errors));
-    auto owned = services_.fileManager.standardizeOwnershipAtURL(bundles, bundleOwnerUserId, bundleOwnerUserId,
-                                                                 firstMobileUserId, services_.setup.check());
+    auto owned = services_.fileManager.standardizeOwnershipAtURL(
+        bundles, services_.configuration.users().installer, services_.configuration.users().installer,
+        services_.configuration.users().first, services_.setup.check());
     if (owned)
         if (const int failure = orderBeforeMarker(bundles); failure < 0)
             owned = posixError({migrationFunction, __LINE__}, -failure, "sync of %s failed: %s", bundles.c_str(),
@@ -137,14 +138,15 @@ std::optional<ZORError> ZORContainerMigrator::cannotLook(const FileURL& former) 
     if (hider)
         return posixError({migrationFunction, __LINE__}, ENOKEY, "An encryption whose key is away hides what is in %s",
                           hider->c_str());
-    if (services_.configuration.homeOf(firstMobileUserId)->look().state == UserHome::State::missing)
-        return posixError({migrationFunction, __LINE__}, ENOENT, "The home of user %u is not there", firstMobileUserId);
+    if (services_.configuration.homeOf(services_.configuration.users().first)->look().state == UserHome::State::missing)
+        return posixError({migrationFunction, __LINE__}, ENOENT, "The home of user %u is not there",
+                          services_.configuration.users().first);
     return std::nullopt;
 }
 
 bool ZORContainerMigrator::mayHoldBundles(const FileURL& former) {
     // Another's directory that its owner named so holds none.
-    if (const auto judged = services_.fileManager.openDirectoryOf(firstMobileUserId, former);
+    if (const auto judged = services_.fileManager.openDirectoryOf(services_.configuration.users().first, former);
         !judged && judged.error().isPosix(EPERM)) {
         services_.log.write(logLevelError, migrationFunction, "%s", judged.error().text().c_str());
         return false;
@@ -168,7 +170,7 @@ Result<void> ZORContainerMigrator::moveFormerBundles(const FileURL& former, cons
 }
 
 bool ZORContainerMigrator::isOfAnother(const FileURL& directory) {
-    const auto judged = services_.fileManager.openDirectoryOf(firstMobileUserId, directory);
+    const auto judged = services_.fileManager.openDirectoryOf(services_.configuration.users().first, directory);
     return !judged && judged.error().isPosix(EPERM);
 }
 
@@ -198,8 +200,8 @@ Result<void> ZORContainerMigrator::moveEachFormerBundle(const FileURL& former) {
             failure = containers.error();
             continue;
         }
-        const auto target =
-            services_.configuration.containerDirectoryURLForUser(bundleOwnerUserId, containerClass, false);
+        const auto target = services_.configuration.containerDirectoryURLForUser(
+            services_.configuration.users().installer, containerClass, false);
         for (const FileURL& container : *containers)
             if (!services_.setup.goOn())
                 return posixError({migrationFunction, __LINE__}, ECANCELED, "The daemon was told to end");
@@ -215,7 +217,7 @@ Result<void> ZORContainerMigrator::moveEachFormerBundle(const FileURL& former) {
     if (holdsOfOthers(former)) {
         services_.log.write(logLevelError, migrationFunction,
                             "%s stays: something in it belongs to others than user %u; move that away, and remove it",
-                            former.c_str(), firstMobileUserId);
+                            former.c_str(), services_.configuration.users().first);
         return {};
     }
     // What is left are directories that held containers, and what never was one. It is in nobody's way.
@@ -233,9 +235,9 @@ Result<void> ZORContainerMigrator::moveFormerBundle(const FileURL& container, co
         return posixError({migrationFunction, __LINE__}, from.error(), "rename of %s to %s failed: %s",
                           container.c_str(), target.c_str(), errorText(from.error()));
     // The old owner's until the end of a migration that was cut short.
-    auto to = fileManager.openDirectoryOf(firstMobileUserId, place);
+    auto to = fileManager.openDirectoryOf(services_.configuration.users().first, place);
     if (!to)
-        to = fileManager.openDirectoryOf(bundleOwnerUserId, place);
+        to = fileManager.openDirectoryOf(services_.configuration.users().installer, place);
     if (!to)
         return std::move(to).error();
     TRY(fileManager.moveItem(from->directory.get(), container, to->get(), target, services_.setup.check()));
@@ -276,24 +278,26 @@ void ZORContainerMigrator::adoptBundlesOfClass(ContainerClass containerClass, Co
 Result<void> ZORContainerMigrator::adoptBundle(const FileURL& container) {
     const Log& log = services_.log;
     // Its owner was the mobile user, and so, perhaps, was its metadata file's.
-    const auto read = readAndValidateMetadataAtUrl(log, services_.fileManager, container, firstMobileUserId,
-                                                   CheckClassPath::yes, firstMobileUserId);
+    const auto read =
+        readAndValidateMetadataAtUrl(log, services_.fileManager, container, services_.configuration.users().first,
+                                     CheckClassPath::yes, services_.configuration.users().first);
     if (!read) {
         log.write(logLevelError, migrationFunction, "Failed to read metadata at URL %s : %s", container.c_str(),
                   read.error().text().c_str());
         return read.error();
     }
     const auto& record = *read;
-    record->setUid(bundleOwnerUserId);
+    record->setUid(services_.configuration.users().installer);
     const auto written = record->writeMetadataToDiskWithError(log, services_.fileManager);
     if (!written)
         return makeError(log, {migrationFunction, __LINE__}, ErrorCode::propertyListNotWritten, &written.error(),
-                         LogFlag::yes, "Failed to write metadata for %u : %s, url: %s", bundleOwnerUserId,
-                         ZOR_SHOWN(record->identifier()), container.c_str());
-    const auto added = services_.cache.addContainerMetadata(record, bundleOwnerUserId, record->place(), false);
+                         LogFlag::yes, "Failed to write metadata for %u : %s, url: %s",
+                         services_.configuration.users().installer, ZOR_SHOWN(record->identifier()), container.c_str());
+    const auto added =
+        services_.cache.addContainerMetadata(record, services_.configuration.users().installer, record->place(), false);
     if (!added)
         return makeError(log, {migrationFunction, __LINE__}, ErrorCode::cacheAddFailed, &added.error(), LogFlag::yes,
-                         "Failed to add to cache for %u : %s, url: %s", bundleOwnerUserId,
+                         "Failed to add to cache for %u : %s, url: %s", services_.configuration.users().installer,
                          ZOR_SHOWN(record->identifier()), container.c_str());
     return {};
 }
@@ -323,9 +327,10 @@ bool ZORContainerMigrator::migrateWellknownOfClass(ContainerClass containerClass
                             className(containerClass));
         return true;
     }
-    const auto classDirectory =
-        services_.configuration.containerDirectoryURLForUser(systemOwnerUserId, containerClass, false);
-    const auto records = services_.cache.allContainersForUser(systemOwnerUserId, containerClass, false);
+    const auto classDirectory = services_.configuration.containerDirectoryURLForUser(
+        services_.configuration.users().system, containerClass, false);
+    const auto records =
+        services_.cache.allContainersForUser(services_.configuration.users().system, containerClass, false);
     if (!records) {
         services_.log.write(logLevelError, whitelistFunction,
                             "Failed to get list of system containers for migration: (error= %s : %lld)",
@@ -361,7 +366,8 @@ Result<bool> ZORContainerMigrator::migrateWellknown(const std::shared_ptr<ZORMet
     if (former == target)
         return false;
     log.write(logLevelError, whitelistFunction, "Migrating well-known container %s", ZOR_SHOWN(identifier));
-    auto removed = services_.cache.removeContainerForUser(systemOwnerUserId, containerClass, &identifier, false);
+    auto removed = services_.cache.removeContainerForUser(services_.configuration.users().system, containerClass,
+                                                          &identifier, false);
     if (!removed) {
         log.write(logLevelError, whitelistFunction,
                   "%s: Failed to remove cache for whitelisted container %s: (error= %s: %lld)", whitelistOperation,
@@ -380,7 +386,8 @@ Result<bool> ZORContainerMigrator::migrateWellknown(const std::shared_ptr<ZORMet
                   code(moved.error()));
         return std::move(moved).error();
     }
-    auto added = services_.cache.addContainerMetadata(record, systemOwnerUserId, ContainerPlace(target), false);
+    auto added = services_.cache.addContainerMetadata(record, services_.configuration.users().system,
+                                                      ContainerPlace(target), false);
     if (!added) {
         log.write(logLevelError, whitelistFunction,
                   "%s: Failed to update cache for whitelisted container %s: (error= %s: %lld)", whitelistOperation,

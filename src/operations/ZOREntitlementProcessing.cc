@@ -132,7 +132,7 @@ void ZOREntitlementMapping::_onQueue_releaseSystemContainer(const plist::Diction
     const bool keeps = entitlements && entitlements->isTrue(entitlementKeys::systemContainer);
     if (keeps || !_onQueue_identifierHasSystemContainer(identifier))
         return;
-    constexpr std::uint32_t user = systemOwnerUserId;
+    const std::uint32_t user = configuration_.users().system;
     const auto record = services_.cache.containerForUser(user, ContainerClass::dataSystem, &identifier, false);
     if (!record) {
         log_.write(logLevelError, processFunction, "Failed to retrieve system container %s: %s", ZOR_SHOWN(identifier),

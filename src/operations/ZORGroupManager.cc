@@ -20,10 +20,11 @@ ContainerClass classOf(GroupType type) {
 
 void ZORGroupManager::forEachUser(GroupType type, const std::function<void(std::uint32_t)>& function) {
     if (type == GroupType::system) {
-        function(systemOwnerUserId);
+        function(services_.configuration.users().system);
         return;
     }
-    for (std::uint32_t userId = firstMobileUserId; userId <= lastMobileUserId; ++userId) {
+    for (std::uint32_t userId = services_.configuration.users().first; userId <= services_.configuration.users().last;
+         ++userId) {
         ZORPerUserConfiguration* user = services_.configuration.getPerUserConfigurationForUserId(userId);
         if (user && user->existsUserBaseDirectory())
             function(userId);
@@ -158,7 +159,7 @@ Result<ZORGroupManager::Paths> ZORGroupManager::groupContainerPathsForUser(std::
         std::vector<FoundContainer> containers;
         {
             const AllIdentifiersLock lock(services_.locks, LockMode::writing);
-            const bool system = userId == systemOwnerUserId;
+            const bool system = userId == services_.configuration.users().system;
             const auto groups = system ? services_.entitlements.systemGroupIdentifiersForIdentifier(*identifier)
                                        : services_.entitlements.appGroupIdentifiersForIdentifier(*identifier);
             // Whoever may ask at all may ask for any identifier's: a path opens nothing, its directory has an owner.

@@ -13,6 +13,7 @@ namespace zor::platform::names {
 inline constexpr const char* identityDirectory = "etc/zorvane/identities.d";
 inline constexpr const char* identityFileSuffix = ".plist";
 inline constexpr const char* wellKnownTable = "etc/zorvane/wellknown.plist";
+inline constexpr const char* configurationFile = "etc/zorvane/zorvaned.conf";
 inline constexpr const char* internalBuildMark = "etc/zorvane/internal-build";
 inline constexpr const char* operatingSystemRelease = "etc/os-release";
 inline constexpr const char* passwordFile = "etc/passwd";
@@ -26,6 +27,7 @@ inline constexpr const char* upcallSocket = ipc::upcallServiceName.data();
 inline constexpr const char* statusSocket = ipc::statusSocketName.data();
 inline constexpr const char* lockFile = "zorvaned.lock";
 inline constexpr const char* lockState = ipc::lockStateFile.data();
+inline constexpr const char* usersFile = ipc::usersFile.data();
 inline constexpr const char* sandboxDirectory = "sandbox";
 inline constexpr const char* assertionDirectory = ipc::assertionDirectory.data();
 

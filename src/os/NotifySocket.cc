@@ -4,18 +4,35 @@
 #include "os/FileDescriptor.h"
 
 #include <cerrno>
+#include <charconv>
 #include <cstddef>
 #include <cstdlib>
 #include <cstring>
 #include <sys/socket.h>
 #include <sys/time.h>
 #include <sys/un.h>
+#include <unistd.h>
 
 namespace zor::platform {
 
 NotifySocket NotifySocket::ofEnvironment() {
     const char* const address = ::secure_getenv("NOTIFY_SOCKET");
     return NotifySocket(address ? address : "");
+}
+
+std::optional<std::chrono::microseconds> NotifySocket::watchdogOfEnvironment() {
+    const auto number = [](const char* name) {
+        const char* const text = ::secure_getenv(name);
+        std::uint64_t value = 0;
+        if (text)
+            (void)std::from_chars(text, text + std::strlen(text), value);
+        return value;
+    };
+    const std::uint64_t process = number("WATCHDOG_PID");
+    const std::uint64_t patience = number("WATCHDOG_USEC");
+    if (patience == 0 || (process != 0 && process != static_cast<std::uint64_t>(::getpid())))
+        return std::nullopt;
+    return std::chrono::microseconds(patience);
 }
 
 int NotifySocket::send(std::string_view state) const {

@@ -2,6 +2,8 @@
 // Tells the service manager how the daemon is, over the datagram socket that NOTIFY_SOCKET names. Any thread.
 #pragma once
 
+#include <chrono>
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -13,6 +15,9 @@ public:
     explicit NotifySocket(std::string address) : address_(std::move(address)) {}
     /// The one of this process's environment.
     [[nodiscard]] static NotifySocket ofEnvironment();
+
+    /// How long the manager waits for each "WATCHDOG=1" of this process, as its environment says; absent: it does not.
+    [[nodiscard]] static std::optional<std::chrono::microseconds> watchdogOfEnvironment();
 
     /// "READY=1", "STOPPING=1", "STATUS=..." or several of them, a line each. 0 (also when nobody wants to know) or an
     /// errno. Waits a few seconds at most.

@@ -3,6 +3,7 @@
 // its own over a temporary root, or hands in a disk that fails.
 #pragma once
 
+#include "ipc/UserNumbers.h"
 #include "platform/Device.h"
 #include "platform/Disk.h"
 #include "platform/PeerIdentity.h"
@@ -17,6 +18,8 @@ class SystemRoot;
 /// References to objects that outlive whoever holds this.
 struct Platform {
     const SystemRoot& root;
+    /// Who owns containers on that root.
+    ipc::UserNumbers users;
     Disk& disk;
     PlatformLog& log;
     InternalBuildQuery& internalBuild;

@@ -8,6 +8,7 @@
 #include <chrono>
 #include <new>
 #include <sys/epoll.h>
+#include <sys/eventfd.h>
 #include <sys/socket.h>
 #include <unistd.h>
 #include <utility>
@@ -51,7 +52,7 @@ public:
     }
 
 private:
-    void arm() { [[maybe_unused]] const bool armed = core_.pool.change(socket_, *this, EPOLLIN | EPOLLONESHOT); }
+    void arm() { [[maybe_unused]] const bool armed = core_.pool.change(socket_, *this, EPOLLIN | EPOLLET); }
 
     void admit(PeerSocket socket) {
         // A peer that connected before the listening socket came to the daemon has not taken it over. Whatever such a
@@ -97,6 +98,33 @@ private:
     ListenerAcceptor acceptor_;
 };
 
+/// Shows that the pool serves: a question that a worker takes, in the turn of the owners of the root.
+class LinuxServiceListener::Probe final : public ListenerTask {
+public:
+    explicit Probe(ListenerPool& pool) : ListenerTask(&line_), pool_(pool) {}
+
+    bool start() { return question_.valid() && pool_.add(question_.get(), *this, EPOLLIN | EPOLLET); }
+    bool answers() {
+        if (asked_.exchange(true))
+            return false;
+        constexpr std::uint64_t one = 1;
+        (void)!::write(question_.get(), &one, sizeof one);
+        return true;
+    }
+
+    void run(ListenerScratch&, std::uint32_t) override {
+        std::uint64_t questions = 0;
+        (void)!::read(question_.get(), &questions, sizeof questions);
+        asked_ = false; // the next question is an event of its own
+    }
+
+private:
+    ListenerLine line_{true, 1};
+    const FileDescriptor question_{::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)};
+    ListenerPool& pool_;
+    std::atomic<bool> asked_{false};
+};
+
 LinuxServiceListener::LinuxServiceListener(PeerIdentity& identity, ListenerOptions options)
     : identity_(identity), options_(std::move(options)) {}
 
@@ -124,7 +152,12 @@ int LinuxServiceListener::begin(ServiceHandler handler) {
     acceptance_ = std::make_unique<Acceptance>(socket_.get(), identity_, *core_);
     if (!core_->pool.start())
         return EAGAIN;
-    return core_->pool.add(socket_.get(), *acceptance_, EPOLLIN | EPOLLONESHOT) ? 0 : errno;
+    probe_ = std::make_unique<Probe>(core_->pool);
+    return core_->pool.add(socket_.get(), *acceptance_, EPOLLIN | EPOLLONESHOT) && probe_->start() ? 0 : errno;
+}
+
+bool LinuxServiceListener::answers() {
+    return probe_ && probe_->answers();
 }
 
 int LinuxServiceListener::takeSocket() {

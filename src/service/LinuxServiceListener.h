@@ -60,11 +60,16 @@ public:
     /// nowhere.
     void stop() override;
 
+    /// Whether the pool has taken the question of the last call; asks it anew. For one thread that calls it now and
+    /// then, between resume and stop.
+    [[nodiscard]] bool answers();
+
     /// All zero before resume. Any thread, but not during resume.
     [[nodiscard]] ListenerCounters counters() const;
 
 private:
     class Acceptance;
+    class Probe;
 
     /// 0 or an errno, and then something may have begun.
     [[nodiscard]] int begin(ServiceHandler handler);
@@ -76,6 +81,7 @@ private:
     PeerSocket socket_;
     std::unique_ptr<ListenerCore> core_;
     std::unique_ptr<Acceptance> acceptance_;
+    std::unique_ptr<Probe> probe_;
 };
 
 } // namespace zor::platform

@@ -1,8 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "service/ListenerCharges.h"
 
-#include "base/UserNumbers.h"
-
 #include <algorithm>
 #include <cstdio>
 #include <cstdlib>
@@ -36,7 +34,8 @@ ListenerCharges::Account* ListenerCharges::openConnection(uid_t uid, bool ownsRo
     if (!ownsRoot && ofOthers_.connections + limits_.connectionsKeptForOwners >= limits_.connectionsMax)
         return nullptr;
     const unsigned threadsMax = ownsRoot ? limits_.threadsMax : std::min(limits_.threadsMaxPerUser, limits_.threadsMax);
-    Account& account = accounts_.try_emplace(ownsRoot ? uid : countedUserId(uid), ownsRoot, threadsMax).first->second;
+    Account& account =
+        accounts_.try_emplace(ownsRoot ? uid : limits_.users.counted(uid), ownsRoot, threadsMax).first->second;
     if (!ownsRoot && account.connections >= limits_.connectionsMaxPerUser)
         return nullptr;
     if (!ownsRoot)

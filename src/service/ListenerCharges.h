@@ -54,7 +54,7 @@ public:
 private:
     const ListenerLimits limits_;
     mutable Mutex mutex_;
-    /// By countedUserId, but for owners of the root.
+    /// By UserNumbers::counted, but for owners of the root.
     std::map<uid_t, Account> accounts_ ZOR_GUARDED_BY(mutex_);
     Totals totals_ ZOR_GUARDED_BY(mutex_);
     /// The part of it that belongs to users who do not own the root.

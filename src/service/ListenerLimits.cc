@@ -28,4 +28,12 @@ ListenerLimits ListenerLimits::forDescriptors(std::size_t descriptorsMax) {
     return limits;
 }
 
+ListenerLimits ListenerLimits::forUsers(const ipc::UserNumbers& owners) const {
+    ListenerLimits limits = *this;
+    limits.users = owners;
+    if (owners.mobileUsers() > users.mobileUsers())
+        limits.threadsMax += threadsMaxPerUser * (owners.mobileUsers() - users.mobileUsers());
+    return limits;
+}
+
 } // namespace zor::platform

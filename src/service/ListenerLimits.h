@@ -3,8 +3,8 @@
 // Tests make these smaller, and so does a process that may have few descriptors; nothing else changes them.
 #pragma once
 
-#include "base/UserNumbers.h"
 #include "ipc/Limits.h"
+#include "ipc/UserNumbers.h"
 
 #include <chrono>
 #include <cstddef>
@@ -18,6 +18,11 @@ struct ListenerLimits {
     /// The limits of a process that may have so many descriptors open: no crowd of connections takes those that the
     /// daemon's work, the upcall and the status need, nor what is kept for the owners.
     [[nodiscard]] static ListenerLimits forDescriptors(std::size_t descriptorsMax);
+    /// These limits where others own containers: more users have more threads, each of them its share.
+    [[nodiscard]] ListenerLimits forUsers(const ipc::UserNumbers& owners) const;
+
+    /// Who has a share of its own; all others have one together.
+    ipc::UserNumbers users;
 
     /// Connections in all, and of any one user that does not own the root.
     std::size_t connectionsMax = 4096;
@@ -56,8 +61,7 @@ struct ListenerLimits {
     unsigned threadsMaxPerUser = 16;
     /// Threads in all, those included that wait inside a handler: each user's share, and one more for the owners of the
     /// root and the system's own users, so that all other users together leave them that.
-    unsigned threadsMax =
-        threadsMaxPerUser * (lastMobileUserId - firstMobileUserId + 1 + strangers) + threadsMaxPerUser;
+    unsigned threadsMax = threadsMaxPerUser * (users.mobileUsers() + strangers) + threadsMaxPerUser;
     /// A thread that is not needed ends after this time.
     std::chrono::milliseconds threadIdle{5000};
     /// How long a handler may wait unannounced before another thread takes its place.

@@ -14,7 +14,7 @@ constexpr const char* groupSubdirectories[] = {"Library", "Library/Caches"};
 ContainerLayout layoutOf(ContainerClass containerClass, std::uint32_t userId) {
     ContainerLayout layout;
     if (isBundleClass(containerClass)) {
-        layout.topLevelOwner = bundleOwnerUserId;
+        layout.topLevelOwner = userId;
         return layout;
     }
     const bool group =

@@ -73,7 +73,7 @@ bool ZORContainerCache::isLeftOpen(const ZORError& error, const Key& key) const 
 }
 
 Result<ZORContainerCache::ClassCache*> ZORContainerCache::_getCacheForUserId(const Key& key) {
-    if (!userIdIsValidForClass(key.containerClass, key.userId))
+    if (!configuration_.users().mayOwn(key.containerClass, key.userId))
         return makeError(log_, ZOR_HERE, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
                          "Invalid cache get-userId %u for class %ld", key.userId, number(key.containerClass));
     const UserHome* const home = homeOf(key);
@@ -403,7 +403,7 @@ bool ZORContainerCache::buildAllOfUser(std::uint32_t userId) {
     for (std::uint64_t number = 1; ipc::isContainerClass(number); ++number)
         for (const bool transient : {false, true}) {
             const Key key{userId, static_cast<ContainerClass>(number), transient};
-            if (!userIdIsValidForClass(key.containerClass, userId))
+            if (!configuration_.users().mayOwn(key.containerClass, userId))
                 continue;
             // A directory that is missing is not made for this, and what cannot be read holds nothing in memory either.
             const auto place = configuration_.placeOfClass(userId, key.containerClass, transient);

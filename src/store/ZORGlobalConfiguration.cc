@@ -1,7 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ZORGlobalConfiguration.h"
 
-#include "base/UserIdentity.h"
 #include "ipc/ContainerClasses.h"
 #include "store/Names.h"
 
@@ -21,24 +20,23 @@ constexpr mode_t closedMode = 0700;
 /// Files of the daemon itself stay readable while the device is locked. The home above them may be missing.
 constexpr DirectoryAttributes ownDirectory{.mode = 0755, .protectionClass = 4, .intermediateMode = closedMode};
 constexpr DirectoryAttributes plainDirectory{.mode = 0755};
-constexpr DirectoryAttributes bundleOwnedDirectory{.mode = 0755, .owner = bundleOwnerUserId};
-/// The migration of an older system's bundles gives the installer the whole place.
-constexpr DirectoryAttributes bundlesDirectory{.mode = 0755, .otherOwner = bundleOwnerUserId};
+
+DirectoryAttributes ownedBy(std::uint32_t installer) {
+    return {.mode = 0755, .owner = installer};
+}
 
 } // namespace
 
 ZORGlobalConfiguration::ZORGlobalConfiguration(const Log& log, ZORFileManager& fileManager,
-                                               const platform::PasswordDatabase& passwords)
-    : log_(log), fileManager_(fileManager), places_(fileManager.resolver()) {
+                                               const platform::PasswordDatabase& passwords, const UserNumbers& users)
+    : log_(log), fileManager_(fileManager), users_(users), places_(fileManager.resolver()) {
     places_.fenceMounts(fileManager);
-    for (std::uint32_t userId = firstMobileUserId; userId <= lastMobileUserId; ++userId)
+    for (std::uint32_t userId = users_.first; userId <= users_.last; ++userId)
         homes_.push_back(std::make_unique<UserHome>(userId, log, fileManager.resolver(), passwords));
 }
 
 UserHome* ZORGlobalConfiguration::homeOf(std::uint32_t userId) const {
-    if (userId < firstMobileUserId || userId > lastMobileUserId)
-        return nullptr;
-    return homes_[userId - firstMobileUserId].get();
+    return users_.isMobile(userId) ? homes_[userId - users_.first].get() : nullptr;
 }
 
 void ZORGlobalConfiguration::makeDirectory(const FileURL& url, const DirectoryAttributes& attributes,
@@ -54,9 +52,7 @@ ZORPerUserConfiguration* ZORGlobalConfiguration::getPerUserConfigurationForUserI
     const auto known = perUserConfigurations_.find(userId);
     if (known != perUserConfigurations_.end())
         return known->second.get();
-    // Outside of them it says so, whosever home it gets.
-    UserHome* const home = homeOf(userId);
-    auto made = ZORPerUserConfiguration::initWithUserId(userId, log_, fileManager_, home ? *home : *homes_.front());
+    auto made = ZORPerUserConfiguration::initWithUserId(userId, log_, fileManager_, homeOf(userId));
     if (!made)
         return nullptr;
     return perUserConfigurations_.emplace(userId, std::move(made)).first->second.get();
@@ -135,7 +131,8 @@ FileURL ZORGlobalConfiguration::bundleDirectory() {
     const RecursiveMutexLock held(lock_);
     sharedContainersDirectory();
     FileURL url = places_.bundleDirectory();
-    makeDirectory(url, bundlesDirectory, __func__, "bundle dir");
+    // The migration of an older system's bundles gives the installer the whole place.
+    makeDirectory(url, {.mode = 0755, .otherOwner = users_.installer}, __func__, "bundle dir");
     return url;
 }
 
@@ -145,7 +142,7 @@ FileURL ZORGlobalConfiguration::transientBundleDirectory() {
     FileURL url = places_.brevadHomeDirectory();
     for (const std::string_view level : names::cachesLevels) {
         url = url.appendingDirectory(level);
-        makeDirectory(url, bundleOwnedDirectory, __func__, "transient bundle dir", Intermediates::no);
+        makeDirectory(url, ownedBy(users_.installer), __func__, "transient bundle dir", Intermediates::no);
     }
     return url;
 }
@@ -180,8 +177,6 @@ Result<bool> ZORGlobalConfiguration::closeHomeDirectory() {
 }
 
 std::uint32_t ZORGlobalConfiguration::ownerOfClassDirectory(ContainerClass containerClass, std::uint32_t userId) {
-    if (isBundleClass(containerClass))
-        return bundleOwnerUserId;
     return isSystemClass(containerClass) ? ownerUnchanged : userId;
 }
 
@@ -200,9 +195,9 @@ std::optional<std::uint32_t> ZORGlobalConfiguration::ownerOfClassDirectory(const
         if (isPerUserClass(containerClass))
             ofUsers.push_back(containerClass);
         else if (isOf(containerClass, std::nullopt))
-            return ownerOfClassDirectory(containerClass, systemOwnerUserId);
+            return ownerOfClassDirectory(containerClass, users_.installer);
     }
-    for (std::uint32_t userId = firstMobileUserId; userId <= lastMobileUserId; ++userId) {
+    for (std::uint32_t userId = users_.first; userId <= users_.last; ++userId) {
         ZORPerUserConfiguration* const user = getPerUserConfigurationForUserId(userId);
         const auto home = user ? user->userHomeDirectory() : std::nullopt;
         if (home &&
@@ -235,7 +230,7 @@ ZORGlobalConfiguration::openClassDirectory(std::uint32_t userId, ContainerClass 
         base = bundle ? transientBundleDirectory() : transientDirectory();
     FileURL url = base.appendingDirectory(className(containerClass));
     auto opened = fileManager_.openOrCreateDirectoryAtURL(url, Intermediates::yes,
-                                                          bundle ? bundleOwnedDirectory : plainDirectory);
+                                                          bundle ? ownedBy(users_.installer) : plainDirectory);
     if (!opened)
         log_.write(logLevelError, "containerDirectoryURLForUser", "Failed to create container dir at \"%s\": %s",
                    url.c_str(), opened.error().text().c_str());

@@ -12,6 +12,7 @@
 #include "base/FileURL.h"
 #include "base/Mutex.h"
 #include "fs/ZORFileManager.h"
+#include "ipc/UserNumbers.h"
 #include "platform/Device.h"
 #include "store/StorePlaces.h"
 #include "store/UserHome.h"
@@ -26,15 +27,21 @@
 
 namespace zor {
 
+using ipc::UserNumbers;
+
 class ZORGlobalConfiguration {
 public:
-    ZORGlobalConfiguration(const Log& log, ZORFileManager& fileManager, const platform::PasswordDatabase& passwords);
+    ZORGlobalConfiguration(const Log& log, ZORFileManager& fileManager, const platform::PasswordDatabase& passwords,
+                           const UserNumbers& users);
 
-    /// The user's configuration, made at the first call; nullptr outside 501 to 510 (tried and logged again each time).
+    /// Who owns containers; never changed.
+    [[nodiscard]] const UserNumbers& users() const { return users_; }
+
+    /// The user's configuration, made at the first call; nullptr for who is none (tried and logged again each time).
     /// Lives as long as this object.
     ZORPerUserConfiguration* getPerUserConfigurationForUserId(std::uint32_t userId);
 
-    /// The home of a mobile user, or nullptr outside 501 to 510. No lock; lives as long as this object.
+    /// The home of a mobile user, or nullptr for who is none. No lock; lives as long as this object.
     [[nodiscard]] UserHome* homeOf(std::uint32_t userId) const;
     /// Knows the homes of all mobile users, so that no way into one crosses a mount. A launch calls it before all else.
     void fenceHomes();
@@ -92,6 +99,7 @@ private:
 
     const Log& log_;
     ZORFileManager& fileManager_;
+    const UserNumbers users_;
     const StorePlaces places_;
     std::vector<std::unique_ptr<UserHome>> homes_; // of every mobile user, in order; never changed
     platform::RecursiveMutex lock_;

@@ -1,7 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ZORPerUserConfiguration.h"
 
-#include "base/UserIdentity.h"
 #include "store/StorePlaces.h"
 
 namespace zor {
@@ -10,13 +9,13 @@ using platform::RecursiveMutexLock;
 
 std::unique_ptr<ZORPerUserConfiguration> ZORPerUserConfiguration::initWithUserId(std::uint32_t userId, const Log& log,
                                                                                  ZORFileManager& fileManager,
-                                                                                 UserHome& home) {
-    if (userId < firstMobileUserId || userId > lastMobileUserId) {
+                                                                                 UserHome* home) {
+    if (!home) {
         log.write(logLevelError, __func__, "userId: %u must be in range", userId);
         return nullptr;
     }
-    std::unique_ptr<ZORPerUserConfiguration> made(new ZORPerUserConfiguration(userId, log, fileManager, home));
-    const auto seen = home.look();
+    std::unique_ptr<ZORPerUserConfiguration> made(new ZORPerUserConfiguration(userId, log, fileManager, *home));
+    const auto seen = home->look();
     if (seen.state == UserHome::State::noAccount || seen.state == UserHome::State::unknown)
         log.write(logLevelError, __func__, "Failed to getpwuid for uid: %u", userId);
     log.write(logLevelError, __func__, "user home Dir: %s", seen.directory ? seen.directory->c_str() : "(null)");

@@ -25,9 +25,9 @@ struct UsableDirectory {
 
 class ZORPerUserConfiguration {
 public:
-    /// nullptr, with a log line, for a user id outside 501 to 510.
+    /// nullptr, with a log line, for who is no mobile user: `home` is null.
     static std::unique_ptr<ZORPerUserConfiguration> initWithUserId(std::uint32_t userId, const Log& log,
-                                                                   ZORFileManager& fileManager, UserHome& home);
+                                                                   ZORFileManager& fileManager, UserHome* home);
 
     [[nodiscard]] std::uint32_t userId() const { return userId_; }
     /// Absent while there is none; then looked for again at each call.

@@ -164,13 +164,13 @@ bool UpcallServer::lookUp(const ProcessContainersRequest& request, ProcessContai
                                              "createOrLookupContainerForUser:");
     if (request.systemContainerIdentifier)
         found.systemContainer =
-            lookups.pathOf(systemOwnerUserId, *request.systemContainerIdentifier, ContainerClass::dataSystem,
-                           "createOrLookupContainerForUser:(system container)");
+            lookups.pathOf(services_.configuration.users().system, *request.systemContainerIdentifier,
+                           ContainerClass::dataSystem, "createOrLookupContainerForUser:(system container)");
     found.appGroups = lookups.pathsOf(request.personaId, request.appGroupIdentifiers, ContainerClass::sharedAppGroup,
                                       "createOrLookupGroupContainersForUser:");
     found.systemGroups =
-        lookups.pathsOf(systemOwnerUserId, request.systemGroupIdentifiers, ContainerClass::sharedSystemGroup,
-                        "createOrLookupContainerForUser:(system group container)");
+        lookups.pathsOf(services_.configuration.users().system, request.systemGroupIdentifiers,
+                        ContainerClass::sharedSystemGroup, "createOrLookupContainerForUser:(system group container)");
     if (found.dataContainer)
         found.temporaryDirectory =
             FileURL::directory(*found.dataContainer).appendingDirectory(names::containerTemporary).path();

@@ -83,7 +83,7 @@ TEST(UserIdentity, RequestsResolveByClassAndClient) {
         support::RecordingLog sink(logLevelNotice);
         const Log log(sink);
         const CountingPasswords passwords(507);
-        UserIdentity users(log, passwords);
+        UserIdentity users(log, passwords, {});
         const auto resolved =
             users.validateUserId(row.requested, static_cast<ContainerClass>(row.containerClass), row.client);
         const std::string text = formatted("Invalid userId %u for class %llu from client %u", row.requested,
@@ -106,7 +106,7 @@ TEST(UserIdentity, TheMobileUserIsLookedUpUntilItIsFound) {
     support::RecordingLog sink(logLevelNotice);
     const Log log(sink);
     CountingPasswords passwords(501);
-    UserIdentity users(log, passwords);
+    UserIdentity users(log, passwords, {});
     for (const int failure : {EMFILE, ENOMEM, EIO, ENOENT, 0, 0}) {
         passwords.failure = failure;
         const int before = passwords.lookups;

@@ -60,8 +60,9 @@ TEST(RefusalLimiter, CountsWhatItLeavesOut) {
     RefusalLimiter::Clock::time_point now{};
     std::map<uid_t, std::uint64_t> reported;
     milliseconds later{0};
-    RefusalLimiter limiter([&](uid_t uid, std::uint64_t count) { reported[uid] += count; },
-                           [&](milliseconds delay) { later = delay; }, [&] { return now; });
+    RefusalLimiter limiter(
+        {}, [&](uid_t uid, std::uint64_t count) { reported[uid] += count; }, [&](milliseconds delay) { later = delay; },
+        [&] { return now; });
     const auto admitted = [&](uid_t uid, int attempts, std::size_t bytes = shortLine) {
         int count = 0;
         for (int i = 0; i < attempts; ++i)

@@ -296,7 +296,7 @@ TEST_F(Create, UsersHaveShares) {
         EXPECT_TRUE(make("a", application, asTransient)); // in the place of the one that was
         EXPECT_TRUE(asUser()->deleteDataContainerContentForUser(mobile, &key, application));
         EXPECT_TRUE(make("a", application, asTransient));
-        EXPECT_TRUE(make("a", ContainerClass::bundleApplication, false, bundleOwnerUserId)); // another's share
+        EXPECT_TRUE(make("a", ContainerClass::bundleApplication, false, UserNumbers().installer)); // another's share
         constexpr auto refused = ErrorCode::propertyListNotWritten;
         EXPECT_EQ(set(*asUser(), application, 700), again ? refused : ErrorCode::success);
         EXPECT_EQ(set(*asUser(), application, 100), again ? refused : ErrorCode::success);

@@ -26,6 +26,7 @@ bool canGiveAway() {
 platform::Platform withRoles(const platform::Platform& real, World& world, platform::BootMarker& marker,
                              platform::WorkQueue& deathRowQueue) {
     return {.root = real.root,
+            .users = real.users,
             .disk = world.disk(),
             .log = world.log,
             .internalBuild = world.internalBuild,

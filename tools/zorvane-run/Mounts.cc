@@ -3,6 +3,7 @@
 
 #include "fs/MountFences.h"
 #include "os/Openat2.h"
+#include "zorvane/Client.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -22,9 +23,8 @@ constexpr const char* systemDirectories[] = {"/usr", "/bin", "/sbin", "/lib", "/
 /// Places that the sandbox fills itself.
 constexpr const char* ownDirectories[] = {"/proc", "/dev", "/tmp"};
 
-// The system's containers are the daemon's; those that an older system made belong to the user that owns them by name.
+// The system's containers are the daemon's, or the user's that owns them by name: an older system made them so.
 constexpr uid_t rootUser = 0;
-constexpr uid_t systemUser = 499;
 
 std::unexpected<Failure> failed(std::string what, std::string advice) {
     return std::unexpected(Failure{.what = std::move(what), .advice = std::move(advice)});
@@ -78,7 +78,8 @@ std::string cannotOpen(const std::string& place, int error) {
 class Collector {
 public:
     Collector(const Root& root, const Options& options, const std::string& home, std::vector<Mount>& mounts)
-        : root_(root), options_(options), home_(home), mounts_(mounts) {}
+        : root_(root), options_(options), home_(home), systemUser_(zorvane::containerOwners(root.path).system),
+          mounts_(mounts) {}
 
     Result<void> container(Mount::Kind kind, const std::string& identifier, const std::string& path) {
         const std::string what = "the " + std::string(kindName(kind)) + " container of " + identifier;
@@ -99,7 +100,7 @@ public:
         if (::fstat(directory->get(), &status) != 0)
             return failed(withReason(what + " " + path + " cannot be read", errno), advice);
         const bool owned =
-            users ? status.st_uid == options_.user : status.st_uid == rootUser || status.st_uid == systemUser;
+            users ? status.st_uid == options_.user : status.st_uid == rootUser || status.st_uid == systemUser_;
         if (!S_ISDIR(status.st_mode) || !owned)
             return failed(what + " " + path + " belongs to user " + std::to_string(status.st_uid) + ", not to " +
                               (users ? "user " + std::to_string(options_.user) : "the system"),
@@ -169,6 +170,7 @@ private:
     const Root& root_;
     const Options& options_;
     const std::string& home_;
+    const uid_t systemUser_;
     std::vector<Mount>& mounts_;
 };
 

@@ -106,6 +106,7 @@ Consent consentOf(const Arguments& arguments) {
 
 /// What can only be told once all options are known. Nothing, or the exit code.
 std::optional<int> finishTarget(Arguments& arguments, const Output& output) {
+    arguments.target.root = arguments.connect.root;
     arguments.target.containerClass = zorvane::containerClassOf(arguments.className).value_or(0);
     if (arguments.user.empty())
         return std::nullopt;
@@ -173,6 +174,9 @@ void addContainerCommands(CLI::App& app, Arguments& arguments, Action& action) {
         "Have the daemon put right what it can; asks first, for all its steps, where one of them deletes");
     check->add_flag("--dry-run", arguments.checking.dryRun, "Only say what a repair would do")->needs(repair);
     addConsent(*check, arguments);
+    addName(*make("init", "Make a root that the daemon can serve: its directories, users, and this program's entry",
+                  [](const Arguments& a, const Output& o) { return zorvanectl::init(a.connect, o, a.account); }),
+            "-u,--user", arguments.account, "Name of an account that is to have containers");
     make("status", "Show how the daemon is doing, and whom it takes this program for",
          [](const Arguments& a, const Output& o) { return zorvanectl::status(a.connect, o); });
 }

@@ -35,6 +35,8 @@ struct Arguments {
     Checking checking;
     InstallOptions install;
     std::string progress;
+    /// The name of one that may be made.
+    std::string account;
     /// Those that help is asked for.
     std::vector<std::string> commands;
 };

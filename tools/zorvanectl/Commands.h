@@ -14,6 +14,8 @@
 namespace zorvanectl {
 
 struct Target {
+    /// The system root, which may have users of its own.
+    std::string root = "/";
     std::uint64_t containerClass = 0;
     /// Nobody named: the class's usual owner.
     std::optional<std::uint32_t> user;
@@ -51,6 +53,10 @@ int usage(const zorvane::ConnectOptions& connect, const Output& output, const Ta
 
 // StatusCommand.cc
 int status(const zorvane::ConnectOptions& connect, const Output& output);
+
+// InitCommand.cc
+/// Makes a root that the daemon can serve, with that account; empty: the usual one, where it is needed.
+int init(const zorvane::ConnectOptions& connect, const Output& output, const std::string& account);
 
 // KnownContainerCommands.cc: a container that is there.
 /// Puts the transient container of an identifier in the place of its live one, or makes it that one.

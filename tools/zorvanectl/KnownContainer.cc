@@ -8,7 +8,7 @@
 namespace zorvanectl {
 
 std::uint32_t userOf(const Target& target) {
-    return target.user.value_or(zorvane::defaultUserOfClass(target.containerClass));
+    return target.user.value_or(zorvane::defaultUserOfClass(target.containerClass, target.root));
 }
 
 zorvane::Result<zorvane::Client::Address> find(zorvane::Client& client, const Target& target, bool transient) {

@@ -2,9 +2,9 @@
 // The identity registry as the daemon reads it: which files count, why others do not, and whom an executable is taken
 // for. Needs no daemon.
 #include "Commands.h"
-#include "base/UserNumbers.h"
 #include "identity/IdentityRegistry.h"
 #include "identity/RegistryReport.h"
+#include "ipc/UserNumbers.h"
 #include "os/FileDescriptor.h"
 #include "os/Names.h"
 #include "os/Openat2.h"
@@ -34,7 +34,7 @@ std::string entitlementsOf(const RegistryFileReport& file) {
 }
 
 bool isForOwnerAlone(const zor::platform::RegistryEntry& entry) {
-    return !entry.userIds && !entry.admitsUser(zor::lastMobileUserId);
+    return !entry.userIds && !entry.admitsUser(zor::ipc::UserNumbers().last);
 }
 
 nlohmann::json toJson(const RegistryFileReport& file) {

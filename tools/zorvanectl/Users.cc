@@ -1,7 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Users.h"
 
-#include "base/UserNumbers.h"
 #include "identity/LinuxPasswordDatabase.h"
 #include "identity/UserNumber.h"
 #include "os/SystemRoot.h"
@@ -41,10 +40,11 @@ std::string shownUser(const std::string& root, std::uint32_t number) {
 
 std::vector<NamedUser> ownersOfClass(const std::string& root, std::uint64_t containerClass) {
     std::vector<NamedUser> owners;
-    const std::uint32_t usual = zorvane::defaultUserOfClass(containerClass);
+    const std::uint32_t usual = zorvane::defaultUserOfClass(containerClass, root);
+    const zorvane::ContainerOwners configured = zorvane::containerOwners(root);
     const bool isSystems = usual != zorvane::currentMobileUser;
-    const std::uint32_t last = isSystems ? usual : zor::lastMobileUserId;
-    for (std::uint32_t number = isSystems ? usual : zor::firstMobileUserId; number <= last; ++number) {
+    const std::uint32_t last = isSystems ? usual : configured.last;
+    for (std::uint32_t number = isSystems ? usual : configured.first; number <= last; ++number) {
         const auto entry = entryFor(root, number);
         if (entry || isSystems || entry.error() != ENOENT)
             owners.push_back({.number = number, .name = entry ? entry->name : std::string()});

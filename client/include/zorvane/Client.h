@@ -47,9 +47,18 @@ inline constexpr std::uint32_t currentMobileUser = 1;
 /// Names of the classes; index is the number, index 0 is no class.
 [[nodiscard]] std::string_view containerClassName(std::uint64_t number);
 inline constexpr std::uint64_t containerClassMax = 13;
-/// The user that owns containers of a class when nobody is named: 33 for bundles, 499 for the system's, else the
-/// current one.
-[[nodiscard]] std::uint32_t defaultUserOfClass(std::uint64_t number);
+/// The users that own containers on a root: as its daemon serves them, the usual numbers where none has run since the
+/// boot. Each call reads a small file. Any thread.
+struct ContainerOwners {
+    std::uint32_t installer; // of bundles, 33 unless configured
+    std::uint32_t system;    // of the system's containers, 499 unless configured
+    std::uint32_t first;     // of the mobile users, 501 to 510 unless configured
+    std::uint32_t last;
+};
+[[nodiscard]] ContainerOwners containerOwners(const std::string& root = "/");
+/// The user that owns containers of a class when nobody is named: the installer of bundles, the system's user of its
+/// own, else the current one.
+[[nodiscard]] std::uint32_t defaultUserOfClass(std::uint64_t number, const std::string& root = "/");
 
 struct Container {
     std::array<std::uint8_t, 16> uuid{}; // the container's identity, not its directory's name

@@ -32,8 +32,8 @@ void replyWithGroupPaths(CommandContext& context, std::uint32_t userId) {
 
 /// The path of a group that the client is entitled to; nullopt when it cannot be had.
 std::optional<std::string> entitledGroupPath(CommandContext& context, const std::string& group) {
-    const auto paths = context.services.groups.groupContainerPathsForUser(systemOwnerUserId, *context.client,
-                                                                          ownIdentifierByDefault(context));
+    const auto paths = context.services.groups.groupContainerPathsForUser(
+        context.services.configuration.users().system, *context.client, ownIdentifierByDefault(context));
     if (!paths)
         return std::nullopt;
     const auto found = paths->find(group);
@@ -42,8 +42,9 @@ std::optional<std::string> entitledGroupPath(CommandContext& context, const std:
 
 std::optional<std::string> wellKnownGroupPath(CommandContext& context, const std::string& group) {
     context.client->setAllowGroupIdLookup(true);
-    const auto found = context.client->createOrLookupContainerForUser(
-        systemOwnerUserId, &group, ContainerClass::sharedSystemGroup, {.createIfNecessary = true});
+    const auto found =
+        context.client->createOrLookupContainerForUser(context.services.configuration.users().system, &group,
+                                                       ContainerClass::sharedSystemGroup, {.createIfNecessary = true});
     return found ? std::optional(found->path) : std::nullopt;
 }
 
@@ -92,8 +93,9 @@ void getSystemContainerPath(CommandContext& context) {
     if (!isOwn && identifier && !context.client->allowOtherIdLookup() &&
         context.services.whitelist.systemContainerIdIsWellknown(*identifier))
         context.client->setAllowOtherIdLookup(true);
-    const auto found = context.client->createOrLookupContainerForUser(
-        systemOwnerUserId, identifier, ContainerClass::dataSystem, {.createIfNecessary = true});
+    const auto found =
+        context.client->createOrLookupContainerForUser(context.services.configuration.users().system, identifier,
+                                                       ContainerClass::dataSystem, {.createIfNecessary = true});
     if (found)
         context.reply.set(keys::replyPath, found->path);
     else
@@ -101,7 +103,7 @@ void getSystemContainerPath(CommandContext& context) {
 }
 
 void getSystemGroupContainerPaths(CommandContext& context) {
-    replyWithGroupPaths(context, systemOwnerUserId);
+    replyWithGroupPaths(context, context.services.configuration.users().system);
 }
 
 void getSystemGroupContainerPath(CommandContext& context) {

@@ -1,0 +1,62 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "identity/UserConfiguration.h"
+
+#include "os/FileDescriptor.h"
+#include "os/Names.h"
+#include "os/Openat2.h"
+
+#include <cerrno>
+#include <cstring>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+namespace zor::platform {
+
+namespace {
+
+/// Four short lines and whatever comments somebody may write.
+constexpr std::size_t fileBytesMax = 64 * 1024;
+
+std::expected<std::string, std::string> readConfiguration(const SystemRoot& root) {
+    const auto file = openInRoot(root.descriptor(), names::configurationFile, O_RDONLY | O_NONBLOCK);
+    if (!file && file.error() == ENOENT)
+        return "";
+    struct stat status{};
+    const int error = !file ? file.error() : ::fstat(file->get(), &status) != 0 ? errno : 0;
+    if (error != 0)
+        return std::unexpected(std::string("cannot be opened: ") + ::strerrordesc_np(error));
+    const bool isTrusted = status.st_uid == 0 || status.st_uid == ::geteuid();
+    if (!isTrusted || (status.st_mode & (S_IWGRP | S_IWOTH)) != 0)
+        return std::unexpected("can be written by others; give it to root and run chmod go-w on it");
+    auto text = readSmallFile(file->get(), fileBytesMax);
+    if (!text)
+        return std::unexpected(std::string("cannot be read: ") + ::strerrordesc_np(text.error()));
+    return std::move(*text);
+}
+
+std::expected<ipc::Account, int> accountOf(const std::expected<PasswordEntry, int>& entry) {
+    if (!entry)
+        return std::unexpected(entry.error());
+    return ipc::Account{.name = entry->name, .number = entry->uid};
+}
+
+} // namespace
+
+std::expected<ipc::ConfiguredUsers, std::string> configuredUsers(const SystemRoot& root,
+                                                                 const PasswordDatabase& passwords) {
+    const std::string path = root.path(names::configurationFile);
+    const auto text = readConfiguration(root);
+    if (!text)
+        return std::unexpected(path + " " + text.error());
+    const ipc::Accounts accounts{
+        .named = [&](std::string_view name) { return accountOf(passwords.entryForName(name)); },
+        .numbered = [&](std::uint32_t number) { return accountOf(passwords.entryForUserId(number)); },
+    };
+    auto users = ipc::readUserNumbers(*text, accounts);
+    if (!users)
+        return std::unexpected(path + ": " + users.error());
+    return std::move(*users);
+}
+
+} // namespace zor::platform

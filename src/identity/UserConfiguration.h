@@ -1,0 +1,22 @@
+// SPDX-License-Identifier: Apache-2.0
+// The configuration of a system root, and what it says of users: read once, when a daemon starts or a tool looks.
+//
+// Whoever can write the file can give the installer's containers to anybody, so one that others than root and the
+// daemon's user can write is refused. Any thread.
+#pragma once
+
+#include "ipc/UserNumbers.h"
+#include "os/SystemRoot.h"
+#include "platform/Device.h"
+
+#include <expected>
+#include <string>
+
+namespace zor::platform {
+
+/// The numbers, those of ipc::UserNumbers where there is no file. Else one line that says what is wrong, in which file,
+/// and what to do.
+[[nodiscard]] std::expected<ipc::ConfiguredUsers, std::string> configuredUsers(const SystemRoot& root,
+                                                                               const PasswordDatabase& passwords);
+
+} // namespace zor::platform
