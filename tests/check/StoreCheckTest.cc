@@ -216,6 +216,13 @@ const std::vector<Damage>& damages() {
          "wellknown.plist"},
         {"somebody's boot marker", [](S s) { s.world.bootMarker.state = {.present = false, .foreign = true}; },
          bootMarkerForeign, launch, "sem.marker"},
+        {"nowhere for transient bundles", [](S s) { files::remove_all(s.world.path("private/var/brevad")); },
+         rootIncomplete, person, "/brevad"},
+        {"an account with the installer's number",
+         [](S s) {
+             std::ofstream(s.world.path("etc/passwd"), std::ios::app) << "www:x:33:33::/private/var/www:/bin/sh\n";
+         },
+         userNumberTaken, person, "/zorvaned.conf"},
     };
     return rows;
 }
