@@ -32,11 +32,9 @@ plist::Dictionary entitlements(const char* group, const char* systemGroup) {
 struct Store {
     Store() {
         registerOwner("org.system", entitlements("group.a", "systemgroup.a"));
-        data = create("org.data", ContainerClass::dataApplication, 501);
-        const std::string identifier = "org.data";
-        dataUuid = world.daemonsClient()
-                       .createOrLookupContainerForUser(501, &identifier, ContainerClass::dataApplication, {})
-                       ->uuid.string();
+        const FoundContainer made = world.make("org.data");
+        data = made.path;
+        dataUuid = made.uuid.string();
         create("org.data", ContainerClass::dataApplication, 501, true);
         create("org.data", ContainerClass::dataApplication, 502);
         create("org.bundle", ContainerClass::bundleApplication, 33);
@@ -55,10 +53,7 @@ struct Store {
     }
     std::string create(const std::string& identifier, ContainerClass containerClass, std::uint32_t user,
                        bool transient = false) {
-        const auto made = world.daemonsClient().createOrLookupContainerForUser(
-            user, &identifier, containerClass, {.createIfNecessary = true, .transient = transient});
-        EXPECT_TRUE(made);
-        return made->path;
+        return world.make(identifier, containerClass, transient, user).path;
     }
     std::vector<Finding> check(CheckOptions options = {.pause = std::chrono::milliseconds(0)}) {
         const auto system = CheckedSystem::open(world.path());
@@ -227,7 +222,6 @@ const std::vector<Damage>& damages() {
     return rows;
 }
 
-// Goal: each kind of damage is found, as what it is, and nothing else is; looking at it changes nothing, follows no
 // What is locked is no damage: one finding says so of what hides it, and nothing of what is in it is mended or missed.
 TEST(StoreCheckTest, WhatIsLockedIsNotDamaged) {
     Store store;
@@ -250,6 +244,7 @@ TEST(StoreCheckTest, WhatIsLockedIsNotDamaged) {
     EXPECT_EQ("/" + findings[0].path, below);
 }
 
+// Goal: each kind of damage is found, as what it is, and nothing else is; looking at it changes nothing, follows no
 // link and waits for nobody. Method: a real store, damaged in one way for each row; the tree before and after compared.
 TEST(StoreCheckTest, FindsEachDamageAndChangesNothing) {
     for (const Damage& damage : damages()) {

@@ -4,6 +4,7 @@
 #include "crash/Scenarios.h"
 #include "operations/ZOREntitlementMapping.h"
 #include "support/FaultLoop.h"
+#include "support/LongRun.h"
 #include "support/PowerCut.h"
 #include "support/ProcessResources.h"
 
@@ -176,10 +177,10 @@ TEST(BootPowerCutTest, TheNextBootFinishesIt) {
         ASSERT_EQ(judgeMigrated(device.root.path(), *device.daemon, Bundle::known), "");
         device.daemon.reset();
         ASSERT_EQ(disk.complaint(), "");
-        const LoopReport report =
-            forEachPowerCut(disk.log(), {.model = model}, [](const PowerCutState&, const std::string& root) {
-                return judgeNextBoots(root, Bundle::known);
-            });
+        const LoopReport report = forEachPowerCut(
+            disk.log(),
+            {.model = model, .randomStatesPerCut = isLongRun() ? 8U : 2U, .singleChangesMax = isLongRun() ? 24U : 8U},
+            [](const PowerCutState&, const std::string& root) { return judgeNextBoots(root, Bundle::known); });
         EXPECT_EQ(report.complaint, "");
         EXPECT_GT(report.examined, 30U);
     }

@@ -4,12 +4,10 @@
 #include "support/FaultDisk.h"
 #include "support/Files.h"
 #include "support/LongRun.h"
-#include "world/UpcallPackets.h"
 
 #include <algorithm>
 #include <functional>
 #include <iterator>
-#include <memory>
 #include <set>
 #include <stdexcept>
 #include <utility>
@@ -157,67 +155,6 @@ Scenario entitlementFile() {
     return scenario;
 }
 
-/// What an upcall asks for, and what its reply names, in the reply's order: one of each kind of container, and two of
-/// each kind that there may be several of.
-struct UpcallItem {
-    Request request;
-    std::uint16_t asked;
-    std::uint16_t answered;
-};
-const std::vector<UpcallItem>& upcallItems() {
-    using namespace upcall;
-    static const std::vector<UpcallItem> items = {
-        {{"com.example.process", ContainerClass::dataApplication, mobileUser},
-         CM_KERN_REQUEST_CONTAINER_ID,
-         CM_KERN_REPLY_DATA_CONTAINER_PATH},
-        {{"group.a", ContainerClass::sharedAppGroup, mobileUser},
-         CM_KERN_REQUEST_APP_GROUP_ID,
-         CM_KERN_REPLY_APP_GROUP_PATH},
-        {{"group.b", ContainerClass::sharedAppGroup, mobileUser},
-         CM_KERN_REQUEST_APP_GROUP_ID,
-         CM_KERN_REPLY_APP_GROUP_PATH},
-        {{"com.example.system", ContainerClass::dataSystem, systemUser},
-         CM_KERN_REQUEST_SYSTEM_CONTAINER_ID,
-         CM_KERN_REPLY_SYSTEM_CONTAINER_PATH},
-        {{"systemgroup.a", ContainerClass::sharedSystemGroup, systemUser},
-         CM_KERN_REQUEST_SYSTEM_GROUP_CONTAINER_ID,
-         CM_KERN_REPLY_SYSTEM_GROUP_PATH},
-        {{"systemgroup.b", ContainerClass::sharedSystemGroup, systemUser},
-         CM_KERN_REQUEST_SYSTEM_GROUP_CONTAINER_ID,
-         CM_KERN_REPLY_SYSTEM_GROUP_PATH},
-    };
-    return items;
-}
-
-/// Promises what a reply with status 1 names.
-void makeUpcall(Device& device) {
-    test::Items items;
-    items.number(upcall::CM_KERN_REQUEST_PERSONA_ID, mobileUser);
-    for (const auto& [request, asked, answered] : upcallItems())
-        items.string(asked, request.identifier);
-    const test::ByteVector packet = items.packet();
-    const test::NoPort port;
-    UpcallServer server(device.daemon->world.services().store(), port);
-    const auto reply = test::replyIn(server.answer({.bytes = packet, .senderPid = 0, .senderUserId = 0}));
-    must(reply.returnCode == 0 && !reply.items.empty(), "no answer to an upcall");
-    if (reply.text(upcall::CM_KERN_REPLY_STATUS) != "1")
-        return;
-    std::size_t told = 0;
-    for (const auto& [type, text] : reply.items)
-        if (told < upcallItems().size() && type == upcallItems()[told].answered)
-            device.promise(upcallItems()[told++].request, text);
-    must(told == upcallItems().size(), "a reply that names too few");
-}
-
-Scenario upcallOfSix() {
-    std::vector<Request> requests;
-    for (const UpcallItem& item : upcallItems())
-        requests.push_back(item.request);
-    return scenarioOf(
-        "upcall that creates six containers", [requests](Device& device) { entitle(device, requests); }, makeUpcall,
-        requests);
-}
-
 Scenario launch() {
     const Request kept{"com.example.first", ContainerClass::dataApplication, mobileUser};
     const Request thrownAway{"com.example.transient", ContainerClass::dataApplication, mobileUser, true};
@@ -265,7 +202,6 @@ std::vector<Scenario> storeScenarios() {
         atHome(deathRow()),
         entitlementFile(),
         atHome(launch()),
-        upcallOfSix(),
     };
 }
 

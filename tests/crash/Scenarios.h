@@ -47,8 +47,7 @@ struct Scenario {
     std::function<std::string(const std::string& root, bool acted)> also;
 };
 
-/// Creation in each group of classes, transient creation again, death row, the entitlement file, the launch and
-/// upcalls.
+/// Creation in each group of classes, transient creation again, death row, the entitlement file, the launch.
 std::vector<Scenario> storeScenarios();
 /// What changes a container that is there.
 std::vector<Scenario> changeScenarios();

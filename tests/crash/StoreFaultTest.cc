@@ -124,11 +124,14 @@ TEST_P(HomeFaultTest, StandsEveryFaultBetweenFileSystems) {
 }
 
 // The same on whatever file system holds temporary files, where a disk has other limits and answers than memory.
-TEST_P(StoreFaultTest, StandsEveryStopOnDisk) {
+class DiskFaultTest : public ::testing::TestWithParam<Scenario> {};
+
+TEST_P(DiskFaultTest, StandsEveryStop) {
     loopOverFaults("/var/tmp", Home::onRoot, GetParam(), {.kind = FaultKind::stop});
 }
 
 INSTANTIATE_TEST_SUITE_P(Store, StoreFaultTest, ::testing::ValuesIn(allScenarios()), scenarioName);
+INSTANTIATE_TEST_SUITE_P(Disk, DiskFaultTest, ::testing::ValuesIn(homeScenarios()), scenarioName);
 INSTANTIATE_TEST_SUITE_P(Home, HomeFaultTest, ::testing::ValuesIn(homeScenarios()), scenarioName);
 
 } // namespace

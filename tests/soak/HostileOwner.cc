@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "soak/HostileOwner.h"
 
+#include "os/FileDescriptor.h"
 #include "support/FileTree.h"
 
 #include <array>
@@ -8,7 +9,9 @@
 #include <fcntl.h>
 #include <filesystem>
 #include <stdexcept>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <unistd.h>
 
 namespace zor::soak {
@@ -94,9 +97,20 @@ zorvane::Result<void> HostileOwner::askOnce(zorvane::Client& client) {
     }
 }
 
+void HostileOwner::askByHalves() {
+    sockaddr_un address{.sun_family = AF_UNIX, .sun_path = {}};
+    session_.daemon().path("run/zorvane/com.veltra.zorvaned").copy(address.sun_path, sizeof address.sun_path - 1);
+    const platform::FileDescriptor socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    const unsigned char frame[] = {75, 0, 0, 0, 1, 0, 0, 0, 1, 0, 0, 0, 0, 0, 0, 0, 'b', 'p', 'l', 'i', 's', 't'};
+    if (::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0)
+        (void)!::send(socket.get(), frame, asking_.upTo(sizeof frame), MSG_NOSIGNAL);
+}
+
 void HostileOwner::ask() {
     std::optional<zorvane::Client> client;
     while (!session_.stopped) {
+        if (asking_.oneIn(8))
+            askByHalves();
         if (!client) {
             session_.connect(client);
             continue;

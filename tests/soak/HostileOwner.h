@@ -25,6 +25,8 @@ public:
 
 private:
     zorvane::Result<void> askOnce(zorvane::Client& client);
+    /// A client that ends in the middle of a frame.
+    void askByHalves();
     void swapOnce(const std::string& victim);
     /// A closed directory of this user's.
     [[nodiscard]] std::string closedOf(uid_t owner) const;

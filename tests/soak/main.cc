@@ -152,6 +152,10 @@ int soak(const Options& options) {
     for (std::thread& thread : threads)
         thread.join();
     surroundings.check();
+    // What ended in the middle of things has left nothing behind.
+    for (const char* counter : {"LockedIdentifiers", "BufferedInputBytes", "BufferedOutputBytes"})
+        if (daemon.counter(counter) != 0)
+            session.found(std::string(counter) + " is " + std::to_string(daemon.counter(counter)));
     if (const std::string changed = hostile.changedOutside(); !changed.empty())
         session.found("what lies outside was changed: " + changed);
     return report(session, surroundings, std::chrono::duration<double>(Clock::now() - begin).count(), daemon.log());

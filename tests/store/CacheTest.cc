@@ -44,16 +44,6 @@ protected:
     }
 };
 
-TEST_F(Cache, IsBuiltOnceAndAsksOnlyForTheFileAfterwards) {
-    put(applications, 1, "a", 11);
-    ASSERT_TRUE(find("a"));
-    put(applications, 2, "b", 12);
-    EXPECT_EQ(codeOf(find("b")), ErrorCode::notFound);
-    EXPECT_FALSE(find("b", asTransient));
-    cache().dropAll();
-    EXPECT_TRUE(find("b"));
-}
-
 // Goal: of two with one identifier the later listed counts. Method: few entries (one thread) and many (two).
 TEST_F(Cache, TheLaterListedCounts) {
     for (const int count : {8, 1000}) {

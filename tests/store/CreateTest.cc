@@ -9,7 +9,6 @@
 #include <array>
 #include <gtest/gtest.h>
 #include <set>
-#include <unistd.h>
 
 namespace zor::test {
 namespace {

@@ -168,12 +168,8 @@ TEST(Options, CommandLine) {
     const Row rows[] = {
         {{"--root"}, 2, "option '--root' needs a value"},
         {{"--log-level", "8"}, 2, "log level '8' is not a number from 0 to 7"},
-        {{"--log-level", "07"}, 2, "log level '07' is not"},
         {{"--log-level", ""}, 2, "log level '' is not"},
-        {{"--log-level", "-1"}, 2, "log level '-1' is not"},
         {{"--nonsense"}, 2, "unknown option '--nonsense'"},
-        {{"-xy"}, 2, "unknown option '-x'"},
-        {{"start"}, 2, "unexpected argument 'start'"},
         {{"--", "start"}, 2, "unexpected argument 'start'"},
         {{"--help", "--nonsense"}, 0, "Usage: zorvaned"},
         {{"--version"}, 0, "zorvaned "},

@@ -5,7 +5,6 @@
 #include "world/World.h"
 
 #include <atomic>
-#include <future>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <thread>
@@ -155,22 +154,6 @@ TEST_F(Deletion, DisksThatRefuse) {
         ASSERT_EQ(world.pass(), ErrorCode::success);
         ASSERT_TRUE(stageBatch(one(world.make("container"))));
     }
-}
-
-// Goal: the deletion of an identifier's container, with the lookup's own codes. Method: requests in a row.
-TEST_F(Deletion, OfAnIdentifier) {
-    const std::string a = "a";
-    const FoundContainer live = world.make(a);
-    const FoundContainer transient = world.make(a, application, asTransient);
-    const auto deletion = [&](ContainerClass containerClass, bool ofTransient) {
-        return codeOf(world.daemonsClient().deleteContainerForUser(mobile, &a, containerClass, ofTransient));
-    };
-    EXPECT_EQ(deletion(ContainerClass::sharedAppGroup, false), ErrorCode::notFound);
-    EXPECT_TRUE(isThere(live.path) && isThere(transient.path));
-    EXPECT_EQ(deletion(application, asTransient), ErrorCode::notFound); // the lookup itself throws it away
-    EXPECT_FALSE(isThere(transient.path));
-    EXPECT_EQ(deletion(application, false), ErrorCode::success);
-    EXPECT_FALSE(isThere(live.path));
 }
 
 enum class Swap { link, file, fifo, aboveIsLink };

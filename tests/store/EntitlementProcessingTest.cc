@@ -293,45 +293,5 @@ TEST_F(Processing, ALostFileStopsDeletions) {
     EXPECT_EQ(count(), 0);
 }
 
-// Goal: paths last and are of own groups; a disk error costs one. Method: askings in a row.
-TEST_F(Processing, GroupPaths) {
-    ASSERT_EQ(process(Dictionary{{apps, Array{"g", "h"}}}, "a"), ErrorCode::success);
-    const auto client = world.client({.bundleIdentifier = "b", .userId = mobile});
-    const auto pathsOf = [&](std::uint32_t user, const std::string& identifier = "a") {
-        return world.services().groups().groupContainerPathsForUser(user, *client, &identifier).value();
-    };
-    EXPECT_TRUE(pathsOf(mobile, "b").empty());
-    world.refuse(DiskCall::createFile, ENOSPC);
-    EXPECT_EQ(pathsOf(mobile).size(), 1U);
-    world.disk().disarm();
-    const auto paths = pathsOf(mobile);
-    EXPECT_EQ(paths.size(), 2U);
-    EXPECT_EQ(pathsOf(mobile), paths);
-    EXPECT_NE(pathsOf(second), paths);
-    EXPECT_TRUE(pathsOf(504).empty()); // no such user
-}
-
-// Goal: who holds a group keeps its container. Method: others register and leave, each seeing itself, meanwhile.
-TEST_F(Processing, AHeldGroupStaysWhileOthersComeAndGo) {
-    const Dictionary entitled{{apps, Array{"g"}}};
-    const std::string holder = "holder";
-    ASSERT_EQ(process(entitled, holder), ErrorCode::success);
-    const std::string path = make(mobile, "g", ContainerClass::sharedAppGroup);
-    inParallel(4, [&](int thread) {
-        const auto client = world.client({.bundleIdentifier = holder, .userId = mobile});
-        for (int i = 0; i < 30; ++i) {
-            const std::string own = "id" + std::to_string(thread);
-            const bool registers = i % 2 == 0;
-            EXPECT_EQ(process(registers ? std::optional(entitled) : std::nullopt, own), ErrorCode::success);
-            EXPECT_EQ(mapping().entitlementsExistForIdentifier(own), registers);
-            EXPECT_EQ(world.services().groups().groupContainerPathsForUser(mobile, *client, &holder).value(),
-                      (ZORGroupManager::Paths{{"g", path}}));
-            EXPECT_TRUE(isThere(path));
-        }
-    });
-    ASSERT_EQ(process({}, holder), ErrorCode::success);
-    EXPECT_FALSE(isThere(path));
-}
-
 } // namespace
 } // namespace zor::test

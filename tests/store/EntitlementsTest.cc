@@ -1,10 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
-// The entitlement map and the table of well-known containers: queries, what a change writes and when, files that are
-// missing, damaged, foreign or cannot be written.
+// The files of the entitlement map and of the table of well-known containers: missing, damaged, foreign, or such that
+// cannot be written.
 #include "world/World.h"
 
 #include <gtest/gtest.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 namespace zor::test {
@@ -15,87 +14,9 @@ using plist::Dictionary;
 using Strings = std::vector<std::string>;
 
 const std::string aside = entitlementFile + ".unreadable";
-const char* const apps = "com.veltra.security.application-groups";
-const char* const groups = "com.veltra.security.system-groups";
-const char* const groupContainers = "com.veltra.security.system-group-containers";
 
 Result<void> set(World& world, const std::vector<Dictionary>& values, const Strings& identifiers) {
     return world.services().entitlements()._setEntitlementDictionaryValues(values, identifiers);
-}
-
-TEST(EntitlementMapping, AMissingFileIsAnEmptyMap) {
-    World world;
-    EXPECT_EQ(world.services().entitlements().entryCount(), 0U);
-    EXPECT_FALSE(world.exists(entitlementFile));
-    EXPECT_FALSE(world.services().entitlements().lostFile());
-}
-
-/// "a b" of a list, "-" of none.
-std::string shown(const std::optional<Strings>& list) {
-    std::string text;
-    for (const std::string& one : list.value_or(Strings{"-"}))
-        text += (text.empty() ? "" : " ") + one;
-    return text;
-}
-
-// Goal: what each form of a group entitlement means. Method: one identifier a row.
-TEST(EntitlementMapping, Queries) {
-    struct Row {
-        const char* identifier;
-        Dictionary entitlements;
-        const char* appGroups;
-        const char* systemGroups;
-    };
-    const std::pair<std::string, plist::Value> c{groupContainers, "systemgroup.c"};
-    const Row rows[] = {
-        {"none", {{"other", 1}}, "-", "-"},
-        {"one", {{apps, "g"}, {groups, "systemgroup.a"}}, "g", "systemgroup.a"},
-        {"many", {{apps, Array{"b", "a", "b"}}}, "a b", "-"},
-        {"manySystem", {{groups, Array{"systemgroup.b", "systemgroup.a"}}}, "-", "systemgroup.a systemgroup.b"},
-        {"number", {{apps, Array{"a", 1}}}, "-", "-"},
-        {"wrong", {{apps, true}}, "-", "-"},
-        {"prefix", {{groups, Array{"systemgroup.a", "b"}}}, "-", "systemgroup.a"},
-        {"alternative", {c}, "-", "systemgroup.c"},
-        {"both", {{groups, "systemgroup.a"}, c}, "-", "systemgroup.a"},
-        {"emptyFirst", {{groups, Array{}}, c}, "-", "systemgroup.c"},
-        {"unprefixedFirst", {{groups, "x"}, c}, "-", ""},
-    };
-    World world;
-    Dictionary map;
-    for (const Row& row : rows)
-        map.set(row.identifier, row.entitlements);
-    map.set("notADictionary", "text");
-    world.write(entitlementFile, binary(map));
-    ZOREntitlementMapping& mapping = world.services().entitlements();
-    for (const Row& row : rows) {
-        SCOPED_TRACE(row.identifier);
-        EXPECT_EQ(shown(mapping.appGroupIdentifiersForIdentifier(row.identifier)), row.appGroups);
-        EXPECT_EQ(shown(mapping.systemGroupIdentifiersForIdentifier(row.identifier)), row.systemGroups);
-    }
-    for (const char* identifier : {"notADictionary", "missing"})
-        EXPECT_FALSE(mapping.appGroupIdentifiersForIdentifier(identifier));
-}
-
-// Goal: a change is written once, whole, and only when there is one. Method: renames counted; a new daemon.
-TEST(EntitlementMapping, SettingWritesOnceWhenSomethingChanges) {
-    World world;
-    std::size_t renames = 0;
-    const auto count = [&](const support::DiskCallInfo& call) {
-        renames += call.call == support::DiskCall::rename && call.subject.ends_with(" -> zor_entitlements.plist");
-        return false;
-    };
-    const Dictionary a{{apps, Array{"g"}}};
-    const Dictionary b{{"k", 1}};
-    ASSERT_TRUE(set(world, {a, b}, {"a", "b"}));
-    world.disk().arm({.filter = count});
-    EXPECT_TRUE(set(world, {a, b, Dictionary{}}, {"a", "b", "never there"}));
-    EXPECT_TRUE(set(world, {}, {}));
-    EXPECT_EQ(renames, 0U);
-    EXPECT_TRUE(set(world, {Dictionary{}, a, b}, {"a", "b", "c"}));
-    world.disk().disarm();
-    EXPECT_EQ(renames, 1U);
-    world.restart();
-    EXPECT_EQ(world.services().entitlements().entitlementMappingDict(), (Dictionary{{"b", a}, {"c", b}}));
 }
 
 // Goal: a file that cannot be believed is kept aside once, and known as lost. Method: all kinds; a second loss.

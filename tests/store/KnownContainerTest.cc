@@ -1,5 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // What is asked of one container by its UUID: info values, its record, its structure, its directory's name, its size.
+#include "operations/ZOREntitlementMapping.h"
+#include "operations/ZORGroupManager.h"
 #include "support/OpenWatch.h"
 #include "world/World.h"
 
@@ -212,9 +214,17 @@ TEST_F(Known, RetryTestCountsDown) {
     EXPECT_TRUE(world.names(applications).empty());
 }
 
-// Goal: operations on one container may run together. Method: a thread for each while its directory is renamed.
+// Goal: operations on one container, and registrations beside them, may run together. Method: a thread for each while
+// its directory is renamed.
 TEST_F(Known, OperationsRunTogether) {
     const Address address = addressOf(world.make("com.example"));
+    world.write(groupMarkerPath, "");
+    // Held by one while another comes and goes.
+    const plist::Dictionary groups{{std::string(entitlementKeys::applicationGroups), plist::Array{"group"}}};
+    const std::string names[] = {"holder", "other"};
+    ZOREntitlementMapping& mapping = world.services().entitlements();
+    ASSERT_EQ(mapping.processEntitlements(&groups, &names[0], nullptr), ErrorCode::success);
+    const std::string group = world.make("group", ContainerClass::sharedAppGroup).path;
     std::atomic<bool> end{false};
     const std::function<void(int)> operations[] = {
         [&](int) { EXPECT_TRUE(client().regenerateDirectoryUUIDForUser(address)); },
@@ -224,6 +234,15 @@ TEST_F(Known, OperationsRunTogether) {
         [&](int) { (void)client().diskUsageForUserId(address); },
         [&](int) { EXPECT_EQ(client().containersForUser(mobile, application, false)->size(), 1U); },
         [&](int) { EXPECT_TRUE(world.find("com.example")); },
+        [&](int i) {
+            EXPECT_EQ(mapping.processEntitlements(i % 2 == 0 ? &groups : nullptr, &names[1], nullptr),
+                      ErrorCode::success);
+            EXPECT_EQ(mapping.entitlementsExistForIdentifier(names[1]), i % 2 == 0);
+        },
+        [&](int) {
+            EXPECT_EQ(world.services().groups().groupContainerPathsForUser(mobile, client(), &names[0]).value(),
+                      (ZORGroupManager::Paths{{"group", group}}));
+        },
     };
     inParallel(static_cast<int>(std::size(operations)), [&](int thread) {
         for (int i = 0; thread == 0 ? i < 80 : !end; ++i)
@@ -231,6 +250,9 @@ TEST_F(Known, OperationsRunTogether) {
         end = end || thread == 0;
     });
     EXPECT_EQ(world.services().locks().identifiersInUse(), 0U);
+    ASSERT_EQ(mapping.processEntitlements(nullptr, &names[1], nullptr), ErrorCode::success);
+    ASSERT_EQ(mapping.processEntitlements(nullptr, &names[0], nullptr), ErrorCode::success);
+    EXPECT_FALSE(isThere(group));
 }
 
 } // namespace

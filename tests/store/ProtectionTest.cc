@@ -1,7 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // Changing the data-protection class of a container: what is judged, what is set where, what waits for an unlock, and
 // what happens to the container meanwhile.
-#include "operations/ZORApplicationTerminationAssertion.h"
 #include "operations/ZORDataProtectionManager.h"
 #include "support/LongRun.h"
 #include "support/OpenWatch.h"
@@ -22,8 +21,6 @@
 namespace zor::test {
 namespace {
 
-using support::DiskCall;
-using support::FaultSpan;
 using Request = ZORDataProtectionManager::Request;
 
 constexpr std::chrono::seconds patience(5);
@@ -397,51 +394,6 @@ TEST_F(Protection, ExceptionsAroundAPass) {
     world.lockStateQueue.inner = usual;
     EXPECT_EQ(world.services().platform().transactions.count(), 0U);
     EXPECT_TRUE(manager().pending().empty());
-}
-
-/// A service that grants, refuses, or has nothing.
-class FakeAssertions final : public platform::TerminationAssertionService {
-public:
-    struct Handle final : Assertion {
-        explicit Handle(int& number) : given(number) { ++given; }
-        ~Handle() override { --given; }
-        int& given;
-    };
-    std::unique_ptr<Assertion> acquire(std::string_view, platform::TerminationReason,
-                                       AcquisitionHandler done) override {
-        if (nothing)
-            return nullptr;
-        answering = std::thread([done, refusal = refusal] { done(refusal); });
-        return std::make_unique<Handle>(given);
-    }
-    [[nodiscard]] std::vector<std::string> held() const override { return {}; }
-    bool nothing = false;
-    std::optional<std::string> refusal;
-    int given = 0;
-    std::thread answering;
-};
-
-// Goal: held from granting to invalidation, none left by a refusal. Method: a service that answers from a thread.
-TEST(TerminationAssertion, GrantedRefusedOrNone) {
-    support::RecordingLog sink(5);
-    const Log log(sink);
-    FakeAssertions service;
-    const auto acquire = [&] {
-        return ZORApplicationTerminationAssertion::initWithBundleIdentifier(log, service, "a", 0);
-    };
-    auto assertion = acquire();
-    service.answering.join();
-    ASSERT_TRUE(assertion);
-    EXPECT_EQ(service.given, 1);
-    for (int i = 0; i < 2; ++i)
-        assertion->invalidate();
-    EXPECT_EQ(service.given, 0);
-    service.refusal = "busy";
-    EXPECT_FALSE(acquire());
-    service.answering.join();
-    EXPECT_EQ(service.given, 0);
-    service.nothing = true;
-    EXPECT_FALSE(acquire());
 }
 
 // Goal: assertions of one application share its file; a killed daemon's is taken over. Method: the real service.

@@ -7,7 +7,6 @@
 #include <array>
 #include <gtest/gtest.h>
 #include <map>
-#include <stdexcept>
 #include <unistd.h>
 
 namespace zor::test {

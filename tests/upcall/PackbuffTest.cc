@@ -232,21 +232,6 @@ TEST(Packbuff, StaysInsideDamagedBytes) {
         }
 }
 
-// Goal: each kind of buffer is released once, as it was got. Method: pages that are looked for afterwards, a heap
-// buffer (whose leak or double release the sanitizers see), one that stays the caller's.
-TEST(Packbuff, ReleasesItsBuffer) {
-    const auto pageBytes = static_cast<std::size_t>(::getpagesize());
-    void* const pages = ::mmap(nullptr, pageBytes, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
-    ASSERT_NE(pages, MAP_FAILED);
-    sb_packbuff_free(sb_packbuff_init_with_buffer(pages, pageBytes, false, packbuffDeallocPages));
-    unsigned char resident = 0;
-    EXPECT_EQ(::mincore(pages, pageBytes, &resident), -1);
-    alignas(8) std::uint8_t own[16] = {};
-    sb_packbuff_free(sb_packbuff_init_with_buffer(std::malloc(16), 16, false, packbuffDeallocFree));
-    sb_packbuff_free(sb_packbuff_init_with_buffer(own, 16, false, packbuffDeallocNone));
-    sb_packbuff_free(nullptr);
-}
-
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__) || defined(__has_feature)
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__) || __has_feature(address_sanitizer) ||               \
     __has_feature(thread_sanitizer)

@@ -2,7 +2,7 @@
 // Bytes for the tests of packed buffers: as people write them, and at the very end of the memory that may be read.
 #pragma once
 
-#include "world/UpcallPackets.h"
+#include "upcall/UpcallPackets.h"
 
 #include <algorithm>
 #include <cstdint>

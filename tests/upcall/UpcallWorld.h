@@ -5,7 +5,7 @@
 
 #include "os/FileDescriptor.h"
 #include "upcall/PackbuffWorld.h"
-#include "world/UpcallPackets.h"
+#include "upcall/UpcallPackets.h"
 #include "world/World.h"
 
 #include <thread>

@@ -4,7 +4,6 @@
 #include "process/DaemonProcess.h"
 #include "process/JsonSchema.h"
 #include "process/Relay.h"
-#include "support/LongRun.h"
 
 #include <algorithm>
 #include <atomic>
@@ -15,7 +14,6 @@
 #include <future>
 #include <gtest/gtest.h>
 #include <poll.h>
-#include <random>
 #include <sched.h>
 #include <set>
 #include <sstream>
@@ -24,7 +22,7 @@
 #include <sys/syscall.h>
 #include <sys/un.h>
 #include <sys/wait.h>
-#include <thread>
+#include <tuple>
 #include <unistd.h>
 
 namespace zor::whole {
@@ -39,19 +37,9 @@ TEST(Life, SecondDaemonAndSigtermAndBrokenCommandLines) {
     EXPECT_EQ(second.exitStatus, 1);
     EXPECT_NE(second.output.find("zorvaned: "), std::string::npos) << second.output;
     EXPECT_EQ(daemon.terminate(), 0);
-    const std::pair<std::vector<std::string>, int> rows[] = {{{"--root"}, 2},
-                                                             {{"--log-level", "x"}, 2},
-                                                             {{"--nothing"}, 2},
-                                                             {{"stray"}, 2},
-                                                             {{"--containers-per-user", "1x"}, 2},
-                                                             {{"--help"}, 0},
-                                                             {{"--version"}, 0},
-                                                             {{"--root", "/nowhere"}, 1}};
-    for (const auto& [arguments, status] : rows) {
-        std::vector<std::string> words = {programPath("zorvaned")};
-        words.insert(words.end(), arguments.begin(), arguments.end());
-        EXPECT_EQ(runProgram(words).exitStatus, status) << arguments[0];
-    }
+    for (const auto& [option, value, status] :
+         {std::tuple("--containers-per-user", "1x", 2), std::tuple("--root", "/nowhere", 1)})
+        EXPECT_EQ(runProgram({programPath("zorvaned"), option, value}).exitStatus, status) << option;
 }
 
 // Goal: a daemon that would take its clients for other processes does not start, and says why. Method: the /proc of
@@ -126,27 +114,6 @@ TEST(Life, FilesThatMayNotGrow) {
                  [&] { return ::setrlimit(RLIMIT_FSIZE, &small) == 0; });
     EXPECT_LT(tool.wait(), 128);
     EXPECT_NE(tool.said().find(std::strerror(EFBIG)), std::string::npos) << tool.said();
-}
-
-// Goal: transient containers end with the boot, others stay; a root that "reboots" does the boot's work once.
-TEST(Life, RebootClearsTransientContainersAndOrphans) {
-    DaemonProcess daemon;
-    daemon.start();
-    ASSERT_TRUE(daemon.client().createOrLookup(dataContainer("kept")));
-    const std::string transient = daemon.client().createOrLookup(dataContainer("passing", true)).value().path;
-    daemon.kill();
-    const std::string classDirectory = daemon.path("private/var/mobile/Containers/Data/Application/");
-    const std::string orphans[] = {classDirectory + "Junk", classDirectory + "6F9619FF-8B86-D011-B42D-00C04FC964FF"};
-    for (const std::string& orphan : orphans)
-        std::filesystem::create_directory(orphan);
-    daemon.start();
-    EXPECT_TRUE(std::filesystem::exists(transient)) << "an ordinary restart is no boot";
-    EXPECT_TRUE(std::filesystem::exists(orphans[0]));
-    daemon.kill();
-    daemon.start({"--forget-boot"});
-    for (const std::string& gone : {transient, orphans[0], orphans[1]})
-        EXPECT_FALSE(std::filesystem::exists(gone)) << gone;
-    EXPECT_TRUE(daemon.client().createOrLookup(dataContainer("kept")).value().existed);
 }
 
 struct ToolCall {

@@ -183,19 +183,13 @@ TEST(Run, CommandLines) {
         {{"--identifier", "", "--user", "501", "sh"}, 125, "--identifier is missing"},
         {{"--identifier", "a.b", "sh"}, 125, "--user is missing"},
         {withUser("0"), 125, "'0' is no user"},
-        {withUser("1"), 125, "'1' is no user"},
         {withUser("501x"), 125, "'501x' is neither a user id nor"},
-        {withUser("4294967295"), 125, "is no user"},
         {withUser("4294967797"), 125, "is neither a user id nor"},
         {{"--network", "lan", "sh"}, 125, "is no network"},
         {{"--identifier", "a.b", "--user", "501", "--"}, 125, "no program"},
-        {{"--identifier", "a.b", "--user", "501", ""}, 125, "no program"},
         {{"--identifier", "a.b", "--user"}, 125, "needs a value"},
         {{"--nothing", "sh"}, 125, "is no option"},
-        {{"--inside"}, 125, "itself"},
         {{"--inside", "0", "0", "none", "/", "sh"}, 125, "itself"},
-        {{"--inside", "0", "501", "lan", "/", "sh"}, 125, "itself"},
-        {{"--identifier", "a.b", "--user", "501", "--root", "/nowhere", "sh"}, 125, "What to do: "},
         {{"--identifier", "a.b", "--user", "501", "--root", empty.path(), "sh", "--user"}, 125, "What to do: "},
     };
     for (const Row& row : rows) {
@@ -370,7 +364,7 @@ TEST(Run, NothingOutlivesTheLauncher) {
     const std::string ready = launcher.data(notes) + "/ready";
     const std::string maker = launcher.daemon.path("maker");
     writeFile(maker, "#!/bin/sh\nsetsid sleep 60 &\ntouch " + ready + "\nsleep 60\n", 0755);
-    constexpr int moments = 60;
+    constexpr int moments = 40;
     for (int moment = 0; moment < moments + 2; ++moment) {
         SCOPED_TRACE(moment);
         Words words = {"--", "sh", "-c", "touch $HOME/ready; sleep 60"};
@@ -382,7 +376,7 @@ TEST(Run, NothingOutlivesTheLauncher) {
         Program run(launcher.words(notes, words), [&] { return ::dup2(ends[1], STDOUT_FILENO) == 1; });
         ::close(ends[1]);
         if (moment < moments)
-            std::this_thread::sleep_for(std::chrono::microseconds(400 * moment));
+            std::this_thread::sleep_for(std::chrono::microseconds(600 * moment));
         else
             EXPECT_TRUE(waitUntil([&] { return files::exists(ready); }));
         run.signal(SIGKILL);

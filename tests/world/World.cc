@@ -6,10 +6,7 @@
 
 #include <algorithm>
 #include <cstdio>
-#include <dirent.h>
-#include <fstream>
 #include <future>
-#include <iterator>
 #include <sched.h>
 #include <stdexcept>
 #include <sys/mount.h>

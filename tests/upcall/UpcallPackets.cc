@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "world/UpcallPackets.h"
+#include "upcall/UpcallPackets.h"
 
 #include <algorithm>
 #include <cstring>
