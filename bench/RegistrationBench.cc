@@ -6,8 +6,8 @@
 
 #include "base/EntitlementKeys.h"
 #include "ipc/Keys.h"
-#include "operations/ZOREntitlementMapping.h"
 #include "store/Names.h"
+#include "store/ZOREntitlementMapping.h"
 
 #include <sys/stat.h>
 

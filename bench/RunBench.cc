@@ -4,7 +4,7 @@
 #include "Benchmarks.h"
 
 #include "ipc/Keys.h"
-#include "operations/ZOREntitlementMapping.h"
+#include "store/ZOREntitlementMapping.h"
 
 #include <array>
 #include <cstdio>

@@ -127,14 +127,15 @@ void ask(ZOREntitlementMapping& mapping, const std::string& key) {
 }
 
 /// Registers another group for a key and drops everything again.
-void change(ZOREntitlementMapping& mapping, const std::string& key) {
+void change(Composition& composition, const std::string& key) {
+    EntitlementChange& change = composition.store().entitlementChange;
     const bool reserved = key == entitlementMapKeys::childPluginBundleIds ||
                           key == entitlementMapKeys::registeredByCaller || key == entitlementMapKeys::placeholder;
     const plist::Dictionary entitlements{{std::string(entitlementKeys::applicationGroups), plist::Array{"h"}}};
     const ErrorCode expected = reserved ? ErrorCode::invalidObject : ErrorCode::success;
-    require(mapping.processEntitlements(&entitlements, &key, nullptr) == expected);
-    require(mapping.processEntitlements(nullptr, &key, nullptr) == expected);
-    require(reserved || !mapping.entitlementsExistForIdentifier(key));
+    require(change.processEntitlements(&entitlements, &key, nullptr) == expected);
+    require(change.processEntitlements(nullptr, &key, nullptr) == expected);
+    require(reserved || !composition.entitlements().entitlementsExistForIdentifier(key));
 }
 
 void run(Device& device, std::span<const std::uint8_t> bytes) {
@@ -151,7 +152,7 @@ void run(Device& device, std::span<const std::uint8_t> bytes) {
         ask(mapping, key);
     for (const auto& [key, entry] : content.value_or(plist::Dictionary()))
         if (key != "added.by.the.fuzzer" && --changes >= 0)
-            change(mapping, key);
+            change(composition, key);
     Composition next(device.roles());
     require(next.entitlements().entryCount() == mapping.entryCount());
     require(next.entitlements().appGroupIdentifiersForIdentifier("added.by.the.fuzzer") ==

@@ -113,25 +113,36 @@ public:
     IdentifierLock& operator=(const IdentifierLock&) = delete;
     ~IdentifierLock() { locks_.unlock_identifier(identifier_); }
 
+    [[nodiscard]] const std::string& identifier() const { return identifier_; }
+
 private:
     ZORLocks& locks_;
     const std::string identifier_;
 };
 
-/// Holds the all-identifiers lock from construction to destruction or `unlock`, whichever comes first.
+/// The same for writing. Who needs that lock held takes a reference to one: the proof that somebody holds it.
+class IdentifierWriteLock final : public IdentifierLock {
+public:
+    IdentifierWriteLock(ZORLocks& locks, std::string identifier)
+        : IdentifierLock(locks, std::move(identifier), LockMode::writing) {}
+};
+
+/// Holds the all-identifiers lock for as long as it lives.
 class AllIdentifiersLock {
 public:
-    AllIdentifiersLock(ZORLocks& locks, LockMode mode) : locks_(&locks) { locks._lock_all_identifiers(mode); }
+    AllIdentifiersLock(ZORLocks& locks, LockMode mode) : locks_(locks) { locks._lock_all_identifiers(mode); }
     AllIdentifiersLock(const AllIdentifiersLock&) = delete;
     AllIdentifiersLock& operator=(const AllIdentifiersLock&) = delete;
-    ~AllIdentifiersLock() { unlock(); }
-    void unlock() {
-        if (locks_)
-            std::exchange(locks_, nullptr)->unlock_all_identifiers();
-    }
+    ~AllIdentifiersLock() { locks_.unlock_all_identifiers(); }
 
 private:
-    ZORLocks* locks_;
+    ZORLocks& locks_;
+};
+
+/// The same for writing, and the proof of it.
+class AllIdentifiersWriteLock final : public AllIdentifiersLock {
+public:
+    explicit AllIdentifiersWriteLock(ZORLocks& locks) : AllIdentifiersLock(locks, LockMode::writing) {}
 };
 
 } // namespace zor

@@ -3,9 +3,9 @@
 #pragma once
 
 #include "base/UserIdentity.h"
+#include "daemon/Operations.h"
+#include "daemon/ZORClientConnection.h"
 #include "ipc/Keys.h"
-#include "operations/StoreServices.h"
-#include "operations/ZORClientConnection.h"
 #include "platform/ServiceListener.h"
 
 #include <array>
@@ -22,7 +22,7 @@ struct CommandContext {
     const std::shared_ptr<ZORClientConnection>& client;
     const std::shared_ptr<platform::ReplyChannel>& channel;
     UserIdentity& users;
-    StoreServices& services;
+    Operations& operations;
     const Log& log;
     /// Success when the handler is entered; a handler that fails stores its code here.
     ErrorCode& error;

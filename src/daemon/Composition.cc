@@ -23,37 +23,22 @@ void Composition::sayLeftOut(uid_t uid, std::uint64_t lines) const {
 }
 
 Composition::Late::Late(Composition& composition)
-    : entitlements(composition.log_, composition.fileManager_, composition.configuration_, services),
-      groups(composition.log_, services),
-      whitelist(ZORWhitelist::forSystem(composition.log_, composition.fileManager_)),
-      migrator(services, composition.platform_.systemVersion), dataProtection(services),
-      services{.log = composition.log_,
-               .boundary = composition.boundary_,
-               .locks = composition.locks_,
-               .fileManager = composition.fileManager_,
-               .durability = composition.durability_,
-               .configuration = composition.configuration_,
-               .cache = composition.cache_,
-               .entitlements = entitlements,
-               .groups = groups,
-               .whitelist = whitelist,
-               .migrator = migrator,
-               .dataProtection = dataProtection,
-               .internalBuild = composition.platform_.internalBuild,
-               .sandbox = composition.platform_.sandbox,
-               .assertions = composition.platform_.assertions,
-               .deathRowQueue = composition.platform_.deathRowQueue,
-               .lockStateQueue = composition.platform_.lockStateQueue,
-               .transactions = composition.platform_.transactions,
-               .sharedClientConnection = nullptr},
-      dispatcher(composition.log_, composition.users_, services),
-      upcallServer(services, composition.platform_.upcallPort) {
-    services.sharedClientConnection = std::make_shared<ZORClientConnection>(
-        services, ZORClientConnection::Client{.bundleIdentifier = "com.veltra.zorvaned.internal",
-                                              .userId = 0,
-                                              .allowOtherIdLookup = true,
-                                              .entitledWipeIdentifiers = std::nullopt});
-}
+    : operations({.log = composition.log_,
+                  .boundary = composition.boundary_,
+                  .locks = composition.locks_,
+                  .fileManager = composition.fileManager_,
+                  .durability = composition.durability_,
+                  .configuration = composition.configuration_,
+                  .cache = composition.cache_},
+                 composition.platform_),
+      sharedClientConnection(std::make_shared<ZORClientConnection>(operations, Caller::daemonItself())),
+      dispatcher(composition.log_, composition.users_, operations),
+      upcallServer({.log = composition.log_,
+                    .boundary = composition.boundary_,
+                    .fileManager = composition.fileManager_,
+                    .configuration = composition.configuration_,
+                    .creation = operations.creation},
+                   composition.platform_.upcallPort) {}
 
 Composition::Late& Composition::late() {
     if (!late_)
@@ -61,8 +46,8 @@ Composition::Late& Composition::late() {
     return *late_;
 }
 
-StoreServices& Composition::store() {
-    return late().services;
+Operations& Composition::store() {
+    return late().operations;
 }
 
 Dispatcher& Composition::dispatcher() {
@@ -73,20 +58,16 @@ UpcallServer& Composition::upcallServer() {
     return late().upcallServer;
 }
 
+UpcallServer::Needs Composition::upcallNeeds() {
+    return {.log = log_,
+            .boundary = boundary_,
+            .fileManager = fileManager_,
+            .configuration = configuration_,
+            .creation = store().creation};
+}
+
 const std::shared_ptr<ZORClientConnection>& Composition::sharedClientConnection() {
-    return late().services.sharedClientConnection;
-}
-
-ZOREntitlementMapping& Composition::entitlements() {
-    return late().entitlements;
-}
-
-ZORGroupManager& Composition::groups() {
-    return late().groups;
-}
-
-const ZORWhitelist& Composition::whitelist() {
-    return late().whitelist;
+    return late().sharedClientConnection;
 }
 
 } // namespace zor

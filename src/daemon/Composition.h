@@ -11,15 +11,11 @@
 #include "base/ZORException.h"
 #include "base/ZORLocks.h"
 #include "daemon/Dispatcher.h"
+#include "daemon/Operations.h"
 #include "daemon/RefusalLimiter.h"
+#include "daemon/ZORClientConnection.h"
 #include "fs/Durability.h"
 #include "fs/ZORFileManager.h"
-#include "operations/StoreServices.h"
-#include "operations/ZORClientConnection.h"
-#include "operations/ZORContainerMigrator.h"
-#include "operations/ZORDataProtectionManager.h"
-#include "operations/ZOREntitlementMapping.h"
-#include "operations/ZORGroupManager.h"
 #include "platform/Platform.h"
 #include "store/ZORContainerCache.h"
 #include "store/ZORGlobalConfiguration.h"
@@ -47,16 +43,17 @@ public:
 
     // Made when they are first asked for: reading the entitlement file belongs to the start of the work, after the log
     // is open. Not before the log is; the first call is made by the thread that starts the daemon.
-    [[nodiscard]] StoreServices& store();
+    [[nodiscard]] Operations& store();
     [[nodiscard]] Dispatcher& dispatcher();
     [[nodiscard]] UpcallServer& upcallServer();
+    [[nodiscard]] UpcallServer::Needs upcallNeeds();
     /// The daemon's own client.
     [[nodiscard]] const std::shared_ptr<ZORClientConnection>& sharedClientConnection();
-    [[nodiscard]] ZOREntitlementMapping& entitlements();
-    [[nodiscard]] ZORGroupManager& groups();
+    [[nodiscard]] ZOREntitlementMapping& entitlements() { return store().entitlements; }
+    [[nodiscard]] ZORGroupManager& groups() { return store().groups; }
     [[nodiscard]] ZORContainerCache& cache() { return cache_; }
     [[nodiscard]] ZORLocks& locks() { return locks_; }
-    [[nodiscard]] const ZORWhitelist& whitelist();
+    [[nodiscard]] const ZORWhitelist& whitelist() { return store().whitelist; }
 
 private:
     struct Late;
@@ -77,12 +74,8 @@ private:
 
     struct Late {
         explicit Late(Composition& composition);
-        ZOREntitlementMapping entitlements;
-        ZORGroupManager groups;
-        ZORWhitelist whitelist;
-        ZORContainerMigrator migrator;
-        ZORDataProtectionManager dataProtection;
-        StoreServices services;
+        Operations operations;
+        std::shared_ptr<ZORClientConnection> sharedClientConnection;
         Dispatcher dispatcher;
         UpcallServer upcallServer;
     };

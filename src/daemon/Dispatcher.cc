@@ -4,7 +4,6 @@
 #include "base/EntitlementKeys.h"
 #include "base/LogSubject.h"
 #include "ipc/Identifier.h"
-#include "operations/ZOREntitlementMapping.h"
 
 #include <algorithm>
 
@@ -122,7 +121,7 @@ bool Dispatcher::serve(platform::PeerConnection& connection, platform::ServiceEv
                            .client = client,
                            .channel = event.reply,
                            .users = users_,
-                           .services = services_,
+                           .operations = operations_,
                            .log = log_,
                            .error = error};
     const bool usable = identifiersAreUsable(context);
@@ -174,19 +173,19 @@ Dispatcher::checkEntitlementsAndInitClientObject(const ZORCommandTableRow& row, 
     if (identifier)
         client.bundleIdentifier = *identifier;
     registerEntitlements(identifier, *identity.grant);
-    return std::make_shared<ZORClientConnection>(services_, std::move(client));
+    return std::make_shared<ZORClientConnection>(operations_, std::move(client));
 }
 
 void Dispatcher::registerEntitlements(const std::string* identifier, const platform::IdentityGrant& grant) const {
-    const std::uint64_t generation = services_.entitlements.generation();
+    const std::uint64_t generation = operations_.entitlements.generation();
     if (grant.registeredGeneration.get() == generation)
         return;
     static const plist::Dictionary byCaller{{std::string(entitlementMapKeys::registeredByCaller), true}};
     const plist::Dictionary& entitlements =
         grant.identifierEntitlements ? *grant.identifierEntitlements : *grant.entitlements;
-    if (identifier && !services_.entitlements.callerRegistrationIsDue(*identifier, entitlements, byCaller))
+    if (identifier && !operations_.entitlements.callerRegistrationIsDue(*identifier, entitlements, byCaller))
         return grant.registeredGeneration.leave(generation);
-    const ErrorCode code = services_.entitlements.processEntitlements(&entitlements, identifier, &byCaller);
+    const ErrorCode code = operations_.entitlementChange.processEntitlements(&entitlements, identifier, &byCaller);
     if (code != ErrorCode::success)
         log_.write(logLevelError, handlerName, "Error processing entitlements for %s : %llu", ZOR_SHOWN(identifier),
                    static_cast<unsigned long long>(code));

@@ -7,7 +7,7 @@
 
 #include "base/UserIdentity.h"
 #include "daemon/CommandTable.h"
-#include "operations/StoreServices.h"
+#include "daemon/Operations.h"
 #include "platform/ServiceListener.h"
 
 #include <atomic>
@@ -19,8 +19,8 @@ namespace zor {
 
 class Dispatcher {
 public:
-    Dispatcher(const Log& log, UserIdentity& users, StoreServices& services)
-        : log_(log), users_(users), services_(services) {}
+    Dispatcher(const Log& log, UserIdentity& users, Operations& operations)
+        : log_(log), users_(users), operations_(operations) {}
     Dispatcher(const Dispatcher&) = delete;
     Dispatcher& operator=(const Dispatcher&) = delete;
 
@@ -47,7 +47,7 @@ private:
 
     const Log& log_;
     UserIdentity& users_;
-    StoreServices& services_;
+    Operations& operations_;
     std::atomic<std::uint64_t> served_{0};
     std::atomic<std::uint64_t> refused_{0};
 };

@@ -3,7 +3,6 @@
 
 #include "base/EntitlementKeys.h"
 #include "ipc/Keys.h"
-#include "operations/ZORDataProtectionManager.h"
 
 #include <unistd.h>
 
@@ -86,7 +85,7 @@ void Status::addProtection(plist::Dictionary& counters) {
 }
 
 void Status::addUnsavedInfo(plist::Dictionary& counters) {
-    if (!composition_.store().someInfoIsNotSaved)
+    if (!composition_.store().infoValues.someIsNotSaved())
         return;
     plist::Array uuids;
     for (const UUID& uuid : composition_.cache().withUnsavedInfo())
@@ -95,7 +94,7 @@ void Status::addUnsavedInfo(plist::Dictionary& counters) {
 }
 
 void Status::addDeathRow(plist::Dictionary& counters) {
-    const DeathRowReport::Left left = composition_.store().deathRow.left();
+    const DeathRow::Left left = composition_.store().deathRow.left();
     counters.set("UndeletedItems", left.count);
     counters.set("UndeletedPaths", plist::Array(left.paths.begin(), left.paths.end()));
 }

@@ -1,19 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
-// Death row: where everything goes that is to be deleted.
-//
-// A move here is one rename on the caller's thread, usually under the locks of its operation; the item gets a name of
-// its own, so names never collide. What lies on another file system than root's death row goes to a death row there
-// (fs/FileSystemDeathRow.h): nothing is ever copied to get out of the way. Passes (DeletionPass.cc) delete it later;
-// what is on death row belongs to no container. A stop at any point leaves items, or empty directories of theirs, for
-// the next pass; the launch queues one.
-//
-// Whoever owns the directory that holds a container can put a directory of another user's in its place. So it is asked
-// before the move whose the directory is, and again when it has come to death row, where nobody can change it any more:
-// another's goes back. A pass waits for that: it takes no item while one is being moved.
+#include "operations/DeathRow.h"
+
 #include "fs/AtomicFile.h"
 #include "fs/FileSystemDeathRow.h"
-#include "operations/StoreServices.h"
-#include "operations/ZORClientConnection.h"
 #include "os/Openat2.h"
 
 #include <cerrno>
@@ -43,15 +32,15 @@ bool isAnothers(const struct stat& status, std::uint32_t owner) {
 
 } // namespace
 
-Result<void> ZORClientConnection::_moveItemAtURLToDeathRow(const FileURL& url, StartDeletionThread startDeletionThread,
-                                                           std::optional<std::uint32_t> owner) {
-    ZORFileManager& fileManager = services_.fileManager;
-    const FileURL deathRow = services_.configuration.deathrowDirectory();
+Result<void> DeathRow::_moveItemAtURLToDeathRow(const FileURL& url, StartDeletionThread startDeletionThread,
+                                                std::optional<std::uint32_t> owner) {
+    ZORFileManager& fileManager = needs_.fileManager;
+    const FileURL deathRow = needs_.configuration.deathrowDirectory();
     for (int tried = 0;; ++tried) {
         std::optional<FileURL> unique;
         // A pass that met the fresh directory before what comes into it has been judged would remove that with it.
-        const auto moved = [&]() -> Result<DeathRow> {
-            const platform::MutexLock moving(services_.deathRow.moving);
+        const auto moved = [&]() -> Result<Row> {
+            const platform::MutexLock moving(moving_);
             auto made = fileManager.createTemporaryDirectoryInDirectoryURL(deathRow);
             if (!made)
                 return std::move(made).error();
@@ -60,9 +49,9 @@ Result<void> ZORClientConnection::_moveItemAtURLToDeathRow(const FileURL& url, S
             return condemn(url, destination, owner, moving);
         }();
         if (!unique)
-            return makeError(services_.log, {moveFunction, __LINE__}, ErrorCode::moveToDeathRowFailed, &moved.error(),
+            return makeError(needs_.log, {moveFunction, __LINE__}, ErrorCode::moveToDeathRowFailed, &moved.error(),
                              LogFlag::yes, "Failed to create unique directory at: %s", url.c_str());
-        if (moved && *moved == DeathRow::ofFileSystem)
+        if (moved && *moved == Row::ofFileSystem)
             (void)fileManager.removeItemAtURL(unique);
         if (moved) {
             if (startDeletionThread == StartDeletionThread::yes)
@@ -76,17 +65,22 @@ Result<void> ZORClientConnection::_moveItemAtURLToDeathRow(const FileURL& url, S
             return {};
         if (somethingMissing && fileManager.itemDoesNotExistAtURL(*unique) && tried < directoriesTriedMax)
             continue;
-        return makeError(services_.log, {moveFunction, __LINE__}, ErrorCode::moveToDeathRowFailed, &moved.error(),
+        return makeError(needs_.log, {moveFunction, __LINE__}, ErrorCode::moveToDeathRowFailed, &moved.error(),
                          LogFlag::yes, "Failed to move item at: %s to: %s", url.c_str(),
                          unique->appendingDirectory(url.lastPathComponent()).c_str());
     }
 }
 
-Result<ZORClientConnection::DeathRow> ZORClientConnection::condemn(const FileURL& url, const FileURL& destination,
-                                                                   std::optional<std::uint32_t> owner,
-                                                                   const platform::MutexLock& /*moving*/) {
-    const auto from = services_.fileManager.resolver().openParent(url);
-    const auto to = services_.fileManager.resolver().openParent(destination);
+Result<DeathRow::Row> DeathRow::condemn(const FileURL& url, const FileURL& destination,
+                                        std::optional<std::uint32_t> owner) {
+    const platform::MutexLock moving(moving_);
+    return condemn(url, destination, owner, moving);
+}
+
+Result<DeathRow::Row> DeathRow::condemn(const FileURL& url, const FileURL& destination,
+                                        std::optional<std::uint32_t> owner, const platform::MutexLock& /*moving*/) {
+    const auto from = needs_.fileManager.resolver().openParent(url);
+    const auto to = needs_.fileManager.resolver().openParent(destination);
     if (!from || !to) {
         const int number = from ? to.error() : from.error();
         return posixError({moveFunction, __LINE__}, number, "open of %s failed: %s",
@@ -94,20 +88,19 @@ Result<ZORClientConnection::DeathRow> ZORClientConnection::condemn(const FileURL
     }
     if (owner)
         TRY(judgeOwner(from->directory.get(), url, *owner));
-    const auto renamed = services_.fileManager.renameItem(from->directory.get(), url, to->directory.get(), destination);
+    const auto renamed = needs_.fileManager.renameItem(from->directory.get(), url, to->directory.get(), destination);
     if (!renamed && renamed.error().isPosix(EXDEV)) {
         TRY(condemnOnItsFileSystem(from->directory.get(), url, owner));
-        return DeathRow::ofFileSystem;
+        return Row::ofFileSystem;
     }
     TRY(renamed);
     if (owner)
         TRY(putBackIfAnothers(from->directory.get(), url, to->directory.get(), destination, *owner));
-    return DeathRow::ofRoot;
+    return Row::ofRoot;
 }
 
-Result<void> ZORClientConnection::condemnOnItsFileSystem(int from, const FileURL& url,
-                                                         std::optional<std::uint32_t> owner) {
-    ZORFileManager& fileManager = services_.fileManager;
+Result<void> DeathRow::condemnOnItsFileSystem(int from, const FileURL& url, std::optional<std::uint32_t> owner) {
+    ZORFileManager& fileManager = needs_.fileManager;
     const auto failed = [&](const FileURL& row, int number) {
         return posixError({moveFunction, __LINE__}, number, "death row %s cannot be used: %s", row.c_str(),
                           errorText(number));
@@ -133,7 +126,7 @@ Result<void> ZORClientConnection::condemnOnItsFileSystem(int from, const FileURL
     }
 }
 
-Result<void> ZORClientConnection::judgeOwner(int directory, const FileURL& url, std::uint32_t owner) {
+Result<void> DeathRow::judgeOwner(int directory, const FileURL& url, std::uint32_t owner) {
     const auto item =
         platform::openBeneathOnMount(directory, std::string(url.lastPathComponent()).c_str(), O_PATH | O_NOFOLLOW);
     struct stat status{};
@@ -144,7 +137,7 @@ Result<void> ZORClientConnection::judgeOwner(int directory, const FileURL& url, 
     // A power cut may have kept a directory that the daemon made and lost who was to own it. An empty one is nobody's
     // loss.
     const bool isHalfMade = status.st_uid == ::geteuid() && S_ISDIR(status.st_mode);
-    if (!isAnothers(status, owner) || (isHalfMade && services_.fileManager.disk().removeDirectory(
+    if (!isAnothers(status, owner) || (isHalfMade && needs_.fileManager.disk().removeDirectory(
                                                          directory, std::string(url.lastPathComponent()).c_str()) == 0))
         return {};
     return posixError({moveFunction, __LINE__}, notTheContainer,
@@ -152,13 +145,13 @@ Result<void> ZORClientConnection::judgeOwner(int directory, const FileURL& url, 
                       owner);
 }
 
-Result<void> ZORClientConnection::putBackIfAnothers(int from, const FileURL& url, int to, const FileURL& destination,
-                                                    std::uint32_t owner) {
+Result<void> DeathRow::putBackIfAnothers(int from, const FileURL& url, int to, const FileURL& destination,
+                                         std::uint32_t owner) {
     const std::string name(destination.lastPathComponent());
     struct stat status{};
     if (::fstatat(to, name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0 || !isAnothers(status, owner))
         return {};
-    platform::Disk& disk = services_.fileManager.disk();
+    platform::Disk& disk = needs_.fileManager.disk();
     const std::string before(url.lastPathComponent());
     // Its place may have been taken meanwhile.
     std::string back = before;
@@ -167,9 +160,9 @@ Result<void> ZORClientConnection::putBackIfAnothers(int from, const FileURL& url
         back = fs::uniqueName(before + ".");
         renamed = disk.rename(to, name.c_str(), from, back.c_str(), 0);
     }
-    services_.log.write(logLevelError, moveFunction, "A directory of user %u was put in the place of %s; %s %s%s%s",
-                        status.st_uid, url.c_str(), renamed == 0 ? "it is back as" : "it could not be put back as",
-                        ZOR_SHOWN(back), renamed == 0 ? "" : ": ", renamed == 0 ? "" : errorText(-renamed));
+    needs_.log.write(logLevelError, moveFunction, "A directory of user %u was put in the place of %s; %s %s%s%s",
+                     status.st_uid, url.c_str(), renamed == 0 ? "it is back as" : "it could not be put back as",
+                     ZOR_SHOWN(back), renamed == 0 ? "" : ": ", renamed == 0 ? "" : errorText(-renamed));
     return posixError({moveFunction, __LINE__}, notTheContainer, "%s was swapped while it was taken away", url.c_str());
 }
 

@@ -11,8 +11,7 @@
 // anybody's to make. Killed between the steps, it is still on death row, closed. Nothing is copied: from another file
 // system than that directory's it stays on its death row, which is closed.
 #include "fs/FileSystemDeathRow.h"
-#include "operations/StoreServices.h"
-#include "operations/ZORClientConnection.h"
+#include "operations/DeathRow.h"
 #include "os/Openat2.h"
 #include "store/Names.h"
 
@@ -53,45 +52,46 @@ bool isClosedAndMarked(int directory) {
 } // namespace
 
 /// The state of one pass.
-struct ZORClientConnection::DeletionPass {
+struct DeathRow::Pass {
     std::optional<ZORError> last;
-    DeathRowReport::Left left;
+    Left left;
     /// Tops of mounts that have been looked at.
     std::set<std::pair<dev_t, ino_t>> seen;
 };
 
-void ZORClientConnection::deleteContainersOnDeathRowWithCompletion(std::function<void(ErrorCode)> completion) {
+void DeathRow::deleteContainersOnDeathRowWithCompletion(std::function<void(ErrorCode)> completion) {
     // A pass that has not begun finds what comes until then: only who wants to be told of its end needs another. Else
     // whoever sends something here over and over would queue passes without end, each of which keeps the daemon busy.
-    std::atomic<bool>& waits = services_.deletionPassWaits;
     const bool isAwaited = completion != nullptr;
-    if (!isAwaited && waits.exchange(true))
+    if (!isAwaited && passWaits_.exchange(true))
         return;
     try {
-        ZORDispatchAsyncWithTransaction(services_.transactions, services_.deathRowQueue,
-                                        [self = shared_from_this(), completion = std::move(completion), isAwaited] {
-                                            if (!isAwaited)
-                                                self->services_.deletionPassWaits = false;
-                                            self->runDeletionPass(completion);
-                                        });
+        ZORDispatchAsyncWithTransaction(needs_.background, [this, completion = std::move(completion), isAwaited] {
+            if (!isAwaited)
+                passWaits_ = false;
+            runDeletionPass(completion);
+        });
     } catch (...) {
         if (!isAwaited)
-            waits = false;
+            passWaits_ = false;
         throw;
     }
 }
 
-void ZORClientConnection::runDeletionPass(const std::function<void(ErrorCode)>& completion) {
-    const auto passed = services_.boundary.run({passFunction, __LINE__}, [&]() -> Result<void> {
-        DeletionPass pass;
+void DeathRow::runDeletionPass(const std::function<void(ErrorCode)>& completion) {
+    const auto passed = needs_.boundary.run({passFunction, __LINE__}, [&]() -> Result<void> {
+        Pass pass;
         deleteWhatIsInTemporary();
         deleteEverythingOnDeathRow(pass);
-        for (const FileURL& place : services_.configuration.placesOfContainers())
+        for (const FileURL& place : needs_.configuration.placesOfContainers())
             deleteEverythingOnDeathRowOf(place, pass);
-        if (services_.deathRow.inTemporary)
-            for (const std::string& name : *services_.deathRow.inTemporary)
-                pass.left.add(services_.configuration.temporaryDirectory().appendingDirectory(name).path());
-        services_.deathRow.set(std::move(pass.left));
+        if (inTemporary_)
+            for (const std::string& name : *inTemporary_)
+                pass.left.add(needs_.configuration.temporaryDirectory().appendingDirectory(name).path());
+        {
+            const platform::MutexLock held(leftMutex_);
+            left_ = std::move(pass.left);
+        }
         if (pass.last)
             return std::move(*pass.last);
         return {};
@@ -100,29 +100,28 @@ void ZORClientConnection::runDeletionPass(const std::function<void(ErrorCode)>& 
         completion(passed ? ErrorCode::success : passed.error().replyCode());
 }
 
-Result<void> ZORClientConnection::forEachCondemned(int directory, const FileURL& row,
-                                                   const std::function<Result<void>(const FileURL&)>& remove,
-                                                   DeletionPass& pass) {
+Result<void> DeathRow::forEachCondemned(int directory, const FileURL& row,
+                                        const std::function<Result<void>(const FileURL&)>& remove, Pass& pass) {
     constexpr Here here{passFunction, __LINE__};
     std::optional<ZORError> unsynced;
     bool first = true;
-    const auto listed = services_.fileManager.forEachItemIn(
+    const auto listed = needs_.fileManager.forEachItemIn(
         directory, row, ZORFileManager::Leftovers::shown, [&](int, const FileURL& item) {
             // Where nothing keeps the order of changes, a power cut could else bring back a container that is half
             // removed.
-            const int status = first ? services_.durability.beforeRemoval(directory) : 0;
+            const int status = first ? needs_.durability.beforeRemoval(directory) : 0;
             first = false;
             if (status < 0) {
                 unsynced = posixError(here, -status, "sync of %s failed: %s", row.c_str(), errorText(-status));
                 return false;
             }
             {
-                const platform::MutexLock judged(services_.deathRow.moving);
+                const platform::MutexLock judged(moving_);
             }
-            const auto removed = services_.boundary.run(here, [&] { return remove(item); });
+            const auto removed = needs_.boundary.run(here, [&] { return remove(item); });
             if (!removed) {
                 pass.left.add(item.path());
-                pass.last = makeError(services_.log, here, ErrorCode::deathRowItemNotDestroyed, &removed.error(),
+                pass.last = makeError(needs_.log, here, ErrorCode::deathRowItemNotDestroyed, &removed.error(),
                                       LogFlag::yes, "Failed to destroy item at: %s", item.c_str());
             }
             return true;
@@ -130,9 +129,9 @@ Result<void> ZORClientConnection::forEachCondemned(int directory, const FileURL&
     return unsynced ? Result<void>(std::move(*unsynced)) : listed;
 }
 
-void ZORClientConnection::deleteEverythingOnDeathRow(DeletionPass& pass) {
-    const FileURL deathRow = services_.configuration.deathrowDirectory();
-    const auto opened = services_.fileManager.resolver().openDirectory(deathRow);
+void DeathRow::deleteEverythingOnDeathRow(Pass& pass) {
+    const FileURL deathRow = needs_.configuration.deathrowDirectory();
+    const auto opened = needs_.fileManager.resolver().openDirectory(deathRow);
     const auto emptied =
         opened ? forEachCondemned(
                      opened->get(), deathRow, [&](const FileURL& item) { return _removeItemOrMoveToTempAtURL(item); },
@@ -143,13 +142,13 @@ void ZORClientConnection::deleteEverythingOnDeathRow(DeletionPass& pass) {
         return;
     pass.last = emptied.error().isPosix(ENOENT)
                     ? emptied.error()
-                    : makeError(services_.log, {passFunction, __LINE__}, ErrorCode::listForDeletionFailed,
+                    : makeError(needs_.log, {passFunction, __LINE__}, ErrorCode::listForDeletionFailed,
                                 &emptied.error(), LogFlag::yes, "Failed to get items for deletion: %s : %s",
                                 deathRow.c_str(), emptied.error().text().c_str());
 }
 
-void ZORClientConnection::deleteEverythingOnDeathRowOf(const FileURL& place, DeletionPass& pass) {
-    ZORFileManager& fileManager = services_.fileManager;
+void DeathRow::deleteEverythingOnDeathRowOf(const FileURL& place, Pass& pass) {
+    ZORFileManager& fileManager = needs_.fileManager;
     const auto top = fs::topOfMount(fileManager.resolver(), place);
     if (!top || !pass.seen.insert(top->identity).second)
         return;
@@ -160,30 +159,30 @@ void ZORClientConnection::deleteEverythingOnDeathRowOf(const FileURL& place, Del
     const auto emptied = forEachCondemned(
         row->get(), url, [&](const FileURL& item) { return fileManager.removeItemIn(row->get(), item); }, pass);
     if (!emptied)
-        pass.last = makeError(services_.log, {passFunction, __LINE__}, ErrorCode::listForDeletionFailed,
-                              &emptied.error(), LogFlag::yes, "Failed to get items for deletion: %s : %s", url.c_str(),
+        pass.last = makeError(needs_.log, {passFunction, __LINE__}, ErrorCode::listForDeletionFailed, &emptied.error(),
+                              LogFlag::yes, "Failed to get items for deletion: %s : %s", url.c_str(),
                               emptied.error().text().c_str());
-    const platform::MutexLock moving(services_.deathRow.moving);
+    const platform::MutexLock moving(moving_);
     fs::removeEmptyDeathRow(fileManager.disk(), top->directory.get());
 }
 
-Result<void> ZORClientConnection::_removeItemOrMoveToTempAtURL(const FileURL& url) {
-    ZORFileManager& fileManager = services_.fileManager;
+Result<void> DeathRow::_removeItemOrMoveToTempAtURL(const FileURL& url) {
+    ZORFileManager& fileManager = needs_.fileManager;
     const auto removed = fileManager.removeItemAtURL(url);
     if (removed || removed.error().isPosix(ENOENT))
         return {};
-    ZOR_LOG(services_.log, logLevelDebug, "Couldn't remove, so moving item to /tmp: %s : %s", url.c_str(),
+    ZOR_LOG(needs_.log, logLevelDebug, "Couldn't remove, so moving item to /tmp: %s : %s", url.c_str(),
             removed.error().text().c_str());
-    const FileURL temporary = services_.configuration.temporaryDirectory();
+    const FileURL temporary = needs_.configuration.temporaryDirectory();
     const auto moved = moveToTemporary(url, temporary.appendingDirectory(url.lastPathComponent()));
     if (moved)
         return {};
-    return makeError(services_.log, ZOR_HERE, ErrorCode::moveToTemporaryFailed, &moved.error(), LogFlag::yes,
+    return makeError(needs_.log, ZOR_HERE, ErrorCode::moveToTemporaryFailed, &moved.error(), LogFlag::yes,
                      "Failed to move dir: %s to: %s", url.c_str(), temporary.c_str());
 }
 
-Result<void> ZORClientConnection::moveToTemporary(const FileURL& url, const FileURL& destination) {
-    ZORFileManager& fileManager = services_.fileManager;
+Result<void> DeathRow::moveToTemporary(const FileURL& url, const FileURL& destination) {
+    ZORFileManager& fileManager = needs_.fileManager;
     const auto item = fileManager.resolver().openDirectory(url);
     const auto from = fileManager.resolver().openParent(url);
     const auto to = fileManager.resolver().openParent(destination);
@@ -193,14 +192,14 @@ Result<void> ZORClientConnection::moveToTemporary(const FileURL& url, const File
     if (number != 0)
         return posixError(ZOR_HERE, number, "closing of %s failed: %s", url.c_str(), errorText(number));
     TRY(fileManager.renameItem(from->directory.get(), url, to->directory.get(), destination));
-    if (services_.deathRow.inTemporary)
-        services_.deathRow.inTemporary->emplace(destination.lastPathComponent());
+    if (inTemporary_)
+        inTemporary_->emplace(destination.lastPathComponent());
     return {};
 }
 
-void ZORClientConnection::findInTemporary(int directory, const FileURL& temporary) {
-    auto& known = services_.deathRow.inTemporary.emplace();
-    (void)services_.fileManager.forEachItemIn(
+void DeathRow::findInTemporary(int directory, const FileURL& temporary) {
+    auto& known = inTemporary_.emplace();
+    (void)needs_.fileManager.forEachItemIn(
         directory, temporary, ZORFileManager::Leftovers::shown, [&](int, const FileURL& item) {
             const std::string name(item.lastPathComponent());
             if (!item.isDirectory())
@@ -213,12 +212,12 @@ void ZORClientConnection::findInTemporary(int directory, const FileURL& temporar
         });
 }
 
-void ZORClientConnection::deleteWhatIsInTemporary() {
-    const FileURL temporary = services_.configuration.temporaryDirectory();
-    const auto directory = services_.fileManager.resolver().openDirectory(temporary);
+void DeathRow::deleteWhatIsInTemporary() {
+    const FileURL temporary = needs_.configuration.temporaryDirectory();
+    const auto directory = needs_.fileManager.resolver().openDirectory(temporary);
     if (!directory)
         return;
-    auto& known = services_.deathRow.inTemporary;
+    auto& known = inTemporary_;
     if (!known)
         findInTemporary(directory->get(), temporary);
     std::erase_if(*known, [&](const std::string& name) {
@@ -228,8 +227,8 @@ void ZORClientConnection::deleteWhatIsInTemporary() {
         if (!opened || !isClosedAndMarked(opened->get()))
             return true;
         const FileURL item = temporary.appendingDirectory(name);
-        return services_.boundary
-            .run({passFunction, __LINE__}, [&] { return services_.fileManager.removeItemIn(directory->get(), item); })
+        return needs_.boundary
+            .run({passFunction, __LINE__}, [&] { return needs_.fileManager.removeItemIn(directory->get(), item); })
             .has_value();
     });
 }

@@ -1,9 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// Info values and the record of one container, by its UUID.
-//
-// A change is one atomic replacement of the metadata file: a stop leaves the old file or the new one.
-#include "operations/StoreServices.h"
-#include "operations/ZORClientConnection.h"
+#include "operations/InfoValues.h"
+
 #include "plist/Value.h"
 
 #include <cerrno>
@@ -13,9 +10,8 @@ namespace zor {
 
 namespace {
 
-std::string lockName(const ZORClientConnection::ContainerAddress& address) {
-    return address.uuid->string();
-}
+constexpr const char* setFunction = "setInfoValue";
+constexpr const char* getFunction = "infoValueForKey";
 
 /// Whether it was the content that made the write fail, not the disk.
 bool cannotBeHeld(const ZORError& error) {
@@ -24,112 +20,119 @@ bool cannotBeHeld(const ZORError& error) {
 
 } // namespace
 
-Result<void> ZORClientConnection::checkAddress(const char* function, const ContainerAddress& address) {
-    if (address.uuid && isValidClass(address.containerClass))
-        return {};
-    return makeError(services_.log, {function, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                     "Can't act on an invalid object: userId: %u, UUID: %s, Class: %ld", address.userId,
-                     address.uuid ? address.uuid->string().c_str() : "(null)",
-                     static_cast<long>(address.containerClass));
-}
-
-Result<std::shared_ptr<ZORMetadata>> ZORClientConnection::knownContainer(const char* function,
-                                                                         const ContainerAddress& address) {
-    auto record = TRY(services_.cache.containerForUser(address.userId, address.containerClass,
-                                                       address.identifier ? &*address.identifier : nullptr,
-                                                       address.uuid->string()));
-    if (record)
-        return record;
-    return makeError(services_.log, {function, __LINE__}, ErrorCode::notFound, nullptr, LogFlag::yes,
-                     "No Container with userId: %u UUID: %s, identifier: %s, Class: %ld", address.userId,
-                     address.uuid->string().c_str(), ZOR_SHOWN(address.identifier),
-                     static_cast<long>(address.containerClass));
-}
-
-Result<void> ZORClientConnection::checkInfoShare(const ZORMetadata& record, const plist::Dictionary& info) {
-    if (ownsRoot())
+Result<void> InfoValues::checkInfoShare(const Caller& caller, const ZORMetadata& record,
+                                        const plist::Dictionary& info) {
+    if (caller.ownsRoot())
         return {};
     const std::size_t before = record.info() ? plist::heldBytes(*record.info()) : 0;
     const std::size_t bytes = plist::heldBytes(info);
     if (bytes <= before)
         return {};
-    const std::size_t held = services_.cache.heldByUser(record.uid()).infoBytes;
-    if (held + bytes - before <= services_.limits.infoBytesMaxPerUser)
+    const std::size_t held = needs_.cache.heldByUser(record.uid()).infoBytes;
+    if (held + bytes - before <= needs_.limits.infoBytesMaxPerUser)
         return {};
     const ZORError cause =
-        posixError({"setInfoValue", __LINE__}, EDQUOT,
+        posixError({setFunction, __LINE__}, EDQUOT,
                    "the info values of user %u's containers take %llu bytes, and no more may be kept", record.uid(),
                    static_cast<unsigned long long>(held));
-    return makeError(services_.log, {"setInfoValue", __LINE__}, ErrorCode::propertyListNotWritten, &cause, LogFlag::yes,
+    return makeError(needs_.log, {setFunction, __LINE__}, ErrorCode::propertyListNotWritten, &cause, LogFlag::yes,
                      "Failed to write metadata dictionary to URL %s", record.url().c_str());
 }
 
-Result<void> ZORClientConnection::setInfoValue(const plist::Value* value, const std::string* key,
-                                               const ContainerAddress& address, UseLocking useLocking) {
-    return services_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
-        constexpr const char* function = "setInfoValue";
-        TRY(checkAddress(function, address));
-        if (!key)
-            return makeError(services_.log, {function, __LINE__}, ErrorCode::valueNotAllowed, nullptr, LogFlag::yes,
-                             "Can't set nil or non-VString key: %s", "(null)");
-        std::optional<IdentifierLock> lock;
-        if (useLocking == UseLocking::yes)
-            lock.emplace(services_.locks, lockName(address), LockMode::writing);
-        const auto record = TRY(knownContainer(function, address));
-        plist::Dictionary info = record->info() ? *record->info() : plist::Dictionary();
-        if (value)
-            info.set(*key, *value);
-        else
-            info.erase(*key);
-        TRY(checkInfoShare(*record, info));
-        const ZORMetadata::Info before = record->info();
-        record->setInfo(std::make_shared<const plist::Dictionary>(std::move(info)));
-        if (auto written = record->writeMetadataToDiskWithError(services_.log, services_.fileManager); !written) {
-            if (cannotBeHeld(written.error())) {
-                record->setInfo(before);
-                return written;
-            }
-            record->setInfoIsSaved(false);
-            services_.someInfoIsNotSaved = true;
+Result<void> InfoValues::checkSet(const std::string* key, const ContainerAddress& address) {
+    TRY(checkAddress(needs_.log, setFunction, address));
+    if (key)
+        return {};
+    return makeError(needs_.log, {setFunction, __LINE__}, ErrorCode::valueNotAllowed, nullptr, LogFlag::yes,
+                     "Can't set nil or non-VString key: %s", "(null)");
+}
+
+Result<void> InfoValues::setInfoValue(const Caller& caller, const plist::Value* value, const std::string* key,
+                                      const ContainerAddress& address) {
+    return needs_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
+        TRY(checkSet(key, address));
+        const IdentifierWriteLock lock(needs_.locks, address.lockName());
+        return set(caller, value, *key, address, lock);
+    });
+}
+
+Result<void> InfoValues::setInfoValue(const Caller& caller, const plist::Value* value, const std::string* key,
+                                      const ContainerAddress& address, const IdentifierWriteLock& held) {
+    return needs_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
+        TRY(checkSet(key, address));
+        return set(caller, value, *key, address, held);
+    });
+}
+
+Result<void> InfoValues::set(const Caller& caller, const plist::Value* value, const std::string& key,
+                             const ContainerAddress& address, const IdentifierWriteLock& held) {
+    const auto record = TRY(knownContainer(needs_.log, needs_.cache, setFunction, address, held));
+    plist::Dictionary info = record->info() ? *record->info() : plist::Dictionary();
+    if (value)
+        info.set(key, *value);
+    else
+        info.erase(key);
+    TRY(checkInfoShare(caller, *record, info));
+    const ZORMetadata::Info before = record->info();
+    record->setInfo(std::make_shared<const plist::Dictionary>(std::move(info)));
+    if (auto written = record->writeMetadataToDiskWithError(needs_.log, needs_.fileManager); !written) {
+        if (cannotBeHeld(written.error())) {
+            record->setInfo(before);
             return written;
         }
-        record->setInfoIsSaved(true);
-        const auto added =
-            services_.cache.addContainerMetadata(record, address.userId, record->place(), record->transient());
-        if (!added)
-            return makeError(services_.log, {function, __LINE__}, ErrorCode::cacheAddFailed, &added.error(),
-                             LogFlag::yes, "Failed to add to cache: %s, url: %s, transient: %d",
-                             ZOR_SHOWN(record->identifier()), record->url().c_str(), record->transient());
+        record->setInfoIsSaved(false);
+        someIsNotSaved_ = true;
+        return written;
+    }
+    record->setInfoIsSaved(true);
+    const auto added = needs_.cache.addContainerMetadata(record, address.userId, record->place(), record->transient());
+    if (!added)
+        return makeError(needs_.log, {setFunction, __LINE__}, ErrorCode::cacheAddFailed, &added.error(), LogFlag::yes,
+                         "Failed to add to cache: %s, url: %s, transient: %d", ZOR_SHOWN(record->identifier()),
+                         record->url().c_str(), record->transient());
+    return {};
+}
+
+Result<void> InfoValues::checkGet(const std::string* key, const ContainerAddress& address) {
+    TRY(checkAddress(needs_.log, getFunction, address));
+    if (key)
         return {};
+    return makeError(needs_.log, {getFunction, __LINE__}, ErrorCode::valueNotAllowed, nullptr, LogFlag::yes,
+                     "Can't get nil or non-VString key: %s", "(null)");
+}
+
+Result<plist::Value> InfoValues::infoValueForKey(const std::string* key, const ContainerAddress& address) {
+    return needs_.boundary.run(ZOR_HERE, [&]() -> Result<plist::Value> {
+        TRY(checkGet(key, address));
+        const IdentifierLock lock(needs_.locks, address.lockName(), LockMode::reading);
+        return get(*key, address, lock);
     });
 }
 
-Result<plist::Value> ZORClientConnection::infoValueForKey(const std::string* key, const ContainerAddress& address,
-                                                          UseLocking useLocking) {
-    return services_.boundary.run(ZOR_HERE, [&]() -> Result<plist::Value> {
-        constexpr const char* function = "infoValueForKey";
-        TRY(checkAddress(function, address));
-        if (!key)
-            return makeError(services_.log, {function, __LINE__}, ErrorCode::valueNotAllowed, nullptr, LogFlag::yes,
-                             "Can't get nil or non-VString key: %s", "(null)");
-        std::optional<IdentifierLock> lock;
-        if (useLocking == UseLocking::yes)
-            lock.emplace(services_.locks, lockName(address), LockMode::reading);
-        const auto record = TRY(knownContainer(function, address));
-        const plist::Value* value = record->info() ? record->info()->find(*key) : nullptr;
-        if (!value)
-            return makeError(services_.log, {function, __LINE__}, ErrorCode::infoKeyNotFound, nullptr, LogFlag::no,
-                             "Didn't find info value for key: %s", ZOR_SHOWN(*key));
-        return *value;
+Result<plist::Value> InfoValues::infoValueForKey(const std::string* key, const ContainerAddress& address,
+                                                 const IdentifierLock& held) {
+    return needs_.boundary.run(ZOR_HERE, [&]() -> Result<plist::Value> {
+        TRY(checkGet(key, address));
+        return get(*key, address, held);
     });
 }
 
-Result<ZORClientConnection::ContainerMetadata> ZORClientConnection::metadataForUser(const ContainerAddress& address) {
-    return services_.boundary.run(ZOR_HERE, [&]() -> Result<ContainerMetadata> {
+Result<plist::Value> InfoValues::get(const std::string& key, const ContainerAddress& address,
+                                     const IdentifierLock& held) {
+    const auto record = TRY(knownContainer(needs_.log, needs_.cache, getFunction, address, held));
+    const plist::Value* value = record->info() ? record->info()->find(key) : nullptr;
+    if (!value)
+        return makeError(needs_.log, {getFunction, __LINE__}, ErrorCode::infoKeyNotFound, nullptr, LogFlag::no,
+                         "Didn't find info value for key: %s", ZOR_SHOWN(key));
+    return *value;
+}
+
+Result<ContainerMetadata> InfoValues::metadataForUser(const ContainerAddress& address) {
+    return needs_.boundary.run(ZOR_HERE, [&]() -> Result<ContainerMetadata> {
         constexpr const char* function = "metadataForUser";
-        TRY(checkAddress(function, address));
-        const IdentifierLock lock(services_.locks, lockName(address), LockMode::reading);
-        const auto record = TRY(knownContainer(function, address));
+        TRY(checkAddress(needs_.log, function, address));
+        const IdentifierLock lock(needs_.locks, address.lockName(), LockMode::reading);
+        const auto record = TRY(knownContainer(needs_.log, needs_.cache, function, address, lock));
         return ContainerMetadata{
             .path = record->url().path(), .transient = record->transient(), .info = record->info()};
     });

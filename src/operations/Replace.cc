@@ -1,27 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
-// Putting a new container in the place of an old one.
-//
-// The one change of the store that takes more than one move, so it has a journal; `ReplaceRecovery.cc` reads it. In
-// order:
-//   1. the new one's file gets the old UUID, where that is preserved   stopped: a transient one is discarded
-//   2. the journal is written                                          stopped: half a file goes; nothing has happened
-//   3. the old one moves to staging                                    stopped: it moves back; nothing has happened
-//   4. the new one moves to its destination                            stopped: done; staging is swept
-//   5. what waits in staging goes to death row, then the journal       stopped: done; the journal goes
-//
-// A power cut leaves the same states: the journal is synced before the first move, the moves keep their order (where
-// the file system does not see to that, syncs do), and they are on the disk before the journal goes and the client
-// hears.
-//
-// A sync that fails behind the first move undoes it; one that fails behind the second leaves the journal, and what
-// waits in staging, to `SettleReplaces.cc`: from there the old one never goes to death row before the moves are on the
-// disk.
-//
-// A replace whose second move fails has lost the old container, which went to death row. So everything that can be
-// looked at beforehand is: both directories can be opened, the destination is free.
+#include "operations/Replace.h"
+
 #include "base/BlockingScope.h"
-#include "operations/StoreServices.h"
-#include "operations/ZORClientConnection.h"
+#include "os/FileDescriptor.h"
 #include "store/ReplaceJournal.h"
 #include "store/ZORWhitelist.h"
 
@@ -35,7 +16,7 @@ namespace zor {
 using platform::FileDescriptor;
 
 /// How far a replace has come; what its clean-up, and the recovery from an exception, go by.
-struct ZORClientConnection::ReplaceProgress {
+struct Replace::Progress {
     std::shared_ptr<ZORMetadata> oldRecord; // nullptr: none is replaced
     std::shared_ptr<ZORMetadata> newRecord;
     bool oldWasTransient = false;
@@ -73,24 +54,22 @@ std::string shown(const std::optional<UUID>& uuid) {
 
 } // namespace
 
-Result<void> ZORClientConnection::replaceContainer(const ReplaceRequest& request,
-                                                   StartDeletionThread startDeletionThread) {
+Result<void> Replace::replaceContainer(const ReplaceRequest& request, StartDeletionThread startDeletionThread) {
     // What is thrown while containers move is dealt with where it happens; the rest has nothing to recover.
-    return services_.boundary.run({replaceFunction, __LINE__},
-                                  [&] { return checkedReplace(request, startDeletionThread); });
+    return needs_.boundary.run({replaceFunction, __LINE__},
+                               [&] { return checkedReplace(request, startDeletionThread); });
 }
 
-Result<void> ZORClientConnection::checkedReplace(const ReplaceRequest& request,
-                                                 StartDeletionThread startDeletionThread) {
-    ReplaceProgress progress;
+Result<void> Replace::checkedReplace(const ReplaceRequest& request, StartDeletionThread startDeletionThread) {
+    Progress progress;
     TRY(checkReplace(request));
     auto swapped = [&]() -> Result<void> {
-        const AllIdentifiersLock lock(services_.locks, LockMode::writing);
+        const AllIdentifiersWriteLock lock(needs_.locks);
         Result<void> result;
         try {
-            result = swapContainers(request, progress);
+            result = swapContainers(request, progress, lock);
         } catch (const std::exception& exception) {
-            result = services_.boundary.caught({replaceFunction, __LINE__}, exception);
+            result = needs_.boundary.caught({replaceFunction, __LINE__}, exception);
             recoverFromException(progress);
         } catch (...) {
             (void)cleanUpReplace(progress, startDeletionThread);
@@ -106,17 +85,18 @@ Result<void> ZORClientConnection::checkedReplace(const ReplaceRequest& request,
     const auto& directories = progress.directories;
     const int dest = directories.dest.get();
     // A journal that came back with the power would undo what comes to the new one later.
-    const int synced = services_.durability.afterMoves(dest, progress.oldRecord ? directories.journals.get() : dest);
+    const int synced =
+        needs_.moves.durability().afterMoves(dest, progress.oldRecord ? directories.journals.get() : dest);
     if (synced < 0)
-        return notLasting(replaceFunction, ErrorCode::newNotMovedIntoPlace, progress.destUrl,
-                          posixError({replaceFunction, __LINE__}, -synced, "sync of %s failed: %s",
-                                     progress.destUrl.c_str(), errorText(-synced)));
+        return needs_.moves.notLasting(replaceFunction, ErrorCode::newNotMovedIntoPlace, progress.destUrl,
+                                       posixError({replaceFunction, __LINE__}, -synced, "sync of %s failed: %s",
+                                                  progress.destUrl.c_str(), errorText(-synced)));
     progress.newRecord->setDurable(true);
     return {};
 }
 
-Result<void> ZORClientConnection::checkReplace(const ReplaceRequest& request) {
-    const Log& log = services_.log;
+Result<void> Replace::checkReplace(const ReplaceRequest& request) {
+    const Log& log = needs_.log;
     const Here here{replaceFunction, __LINE__};
     if (!request.newUuid || !isValidClass(request.classNew))
         return makeError(log, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
@@ -142,8 +122,9 @@ Result<void> ZORClientConnection::checkReplace(const ReplaceRequest& request) {
     return {};
 }
 
-Result<void> ZORClientConnection::swapContainers(const ReplaceRequest& request, ReplaceProgress& progress) {
-    TRY(prepareReplace(request, progress));
+Result<void> Replace::swapContainers(const ReplaceRequest& request, Progress& progress,
+                                     const AllIdentifiersWriteLock& lock) {
+    TRY(prepareReplace(request, progress, lock));
     if (progress.oldRecord)
         TRY(moveOldAway(request, progress));
     else if (const auto opened = openDirectories(progress, {}); !opened)
@@ -151,19 +132,20 @@ Result<void> ZORClientConnection::swapContainers(const ReplaceRequest& request, 
     return putNewInPlace(request, progress);
 }
 
-ZORError ZORClientConnection::notInPlace(const ReplaceProgress& progress, const ZORError& cause) {
-    return makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::newNotMovedIntoPlace, &cause, LogFlag::yes,
+ZORError Replace::notInPlace(const Progress& progress, const ZORError& cause) {
+    return makeError(needs_.log, {replaceFunction, __LINE__}, ErrorCode::newNotMovedIntoPlace, &cause, LogFlag::yes,
                      "Failed to replace: %s with: %s at: %s", progress.oldUrl.c_str(), progress.newUrl.c_str(),
                      progress.destUrl.c_str());
 }
 
-Result<void> ZORClientConnection::prepareReplace(const ReplaceRequest& request, ReplaceProgress& progress) {
-    const Log& log = services_.log;
+Result<void> Replace::prepareReplace(const ReplaceRequest& request, Progress& progress,
+                                     const AllIdentifiersWriteLock& lock) {
+    const Log& log = needs_.log;
     const Here here{replaceFunction, __LINE__};
     const auto known = [&](std::uint32_t userId, const std::optional<UUID>& uuid,
                            const std::optional<std::string>& identifier,
                            ContainerClass containerClass) -> Result<std::shared_ptr<ZORMetadata>> {
-        auto record = TRY(settledContainer(userId, containerClass, pointerTo(identifier), *uuid));
+        auto record = TRY(needs_.recovery.settledContainer(userId, containerClass, pointerTo(identifier), *uuid, lock));
         if (!record)
             return makeError(log, here, ErrorCode::notFound, nullptr, LogFlag::yes,
                              "No Container with userId: %u UUID: %s, identifier: %s, Class: %ld", userId,
@@ -187,45 +169,45 @@ Result<void> ZORClientConnection::prepareReplace(const ReplaceRequest& request, 
     if (request.preserveOldUuid == PreserveOldUUID::yes) {
         progress.destUrl = progress.oldUrl;
     } else {
-        const auto classDirectory = services_.configuration.containerDirectoryURLForUser(
+        const auto classDirectory = needs_.configuration.containerDirectoryURLForUser(
             request.userIdNew, request.classNew, progress.oldWasTransient);
         // A well-known container lives under its name, whichever it is.
         const std::string* wellKnown =
             progress.oldWasTransient
                 ? nullptr
-                : services_.whitelist.wellknownContainerForId(progress.newRecord->identifier(), request.classNew);
+                : needs_.whitelist.wellknownContainerForId(progress.newRecord->identifier(), request.classNew);
         if (classDirectory)
             progress.destUrl = classDirectory->appendingDirectory(wellKnown ? *wellKnown : directoryUuid->string());
         if (!classDirectory ||
-            (progress.destUrl != progress.oldUrl && !services_.fileManager.itemDoesNotExistAtURL(progress.destUrl)))
+            (progress.destUrl != progress.oldUrl && !needs_.fileManager.itemDoesNotExistAtURL(progress.destUrl)))
             return makeError(log, here, ErrorCode::alreadyExists, nullptr, LogFlag::yes,
                              "Container already exists at %s", progress.destUrl.c_str());
     }
     return refuseSecondOfIdentifier(progress);
 }
 
-Result<void> ZORClientConnection::refuseSecondOfIdentifier(const ReplaceProgress& progress) {
+Result<void> Replace::refuseSecondOfIdentifier(const Progress& progress) {
     const ZORMetadata& record = *progress.newRecord;
     if (progress.oldRecord && progress.oldRecord->identifier() == record.identifier())
         return {};
-    const auto live = services_.cache.containerForUser(record.uid(), record.containerClass(), &record.identifier(),
-                                                       progress.oldWasTransient);
+    const auto live = needs_.cache.containerForUser(record.uid(), record.containerClass(), &record.identifier(),
+                                                    progress.oldWasTransient);
     if (!live && !live.error().is(ErrorCode::notFound) && (!progress.oldRecord || live.error().isOwnShortage()))
         return live.error();
     // With an old one, the one that is found may be the new one itself; one that has lost its files is none.
     if (!live || (progress.oldRecord && *live == progress.newRecord))
         return {};
-    return makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::alreadyExists, nullptr, LogFlag::yes,
+    return makeError(needs_.log, {replaceFunction, __LINE__}, ErrorCode::alreadyExists, nullptr, LogFlag::yes,
                      "Container with identifier: %s, class: %ld, transient: %d already exists",
                      ZOR_SHOWN(record.identifier()), static_cast<long>(record.containerClass()),
                      progress.oldWasTransient);
 }
 
-Result<void> ZORClientConnection::moveOldAway(const ReplaceRequest& request, ReplaceProgress& progress) {
-    const Log& log = services_.log;
+Result<void> Replace::moveOldAway(const ReplaceRequest& request, Progress& progress) {
+    const Log& log = needs_.log;
     const Here here{replaceFunction, __LINE__};
     const UUID journalUuid = UUID::random();
-    const FileURL stagingUrl = services_.configuration.stagingDirectory().appendingDirectory(journalUuid.string());
+    const FileURL stagingUrl = needs_.configuration.stagingDirectory().appendingDirectory(journalUuid.string());
     const auto oldNotMoved = [&](const ZORError& cause) {
         return makeError(log, here, ErrorCode::oldNotMovedToStaging, &cause, LogFlag::yes,
                          "Failed to move old %s to staging %s", progress.oldUrl.c_str(), stagingUrl.c_str());
@@ -234,47 +216,47 @@ Result<void> ZORClientConnection::moveOldAway(const ReplaceRequest& request, Rep
     const std::uint32_t owner =
         ZORGlobalConfiguration::ownerOfClassDirectory(request.classNew, progress.newRecord->uid());
     for (const FileURL* url : {&progress.oldUrl, &progress.newUrl})
-        if (const auto opened = services_.fileManager.openDirectoryOf(owner, *url); !opened)
+        if (const auto opened = needs_.fileManager.openDirectoryOf(owner, *url); !opened)
             return oldNotMoved(opened.error());
     if (const auto opened = openDirectories(progress, stagingUrl); !opened)
         return oldNotMoved(opened.error());
     if (request.preserveOldUuid == PreserveOldUUID::yes) {
         progress.newUuidBefore = progress.newRecord->uuid();
         progress.newRecord->setUuid(progress.oldRecord->uuid());
-        TRY(progress.newRecord->writeMetadataToDiskWithError(log, services_.fileManager));
+        TRY(progress.newRecord->writeMetadataToDiskWithError(log, needs_.fileManager));
     }
-    const FileURL journalUrl = ReplaceJournal::urlFor(services_.configuration.replaceDirectory(), journalUuid);
+    const FileURL journalUrl = ReplaceJournal::urlFor(needs_.configuration.replaceDirectory(), journalUuid);
     progress.stagingUrl = stagingUrl;
     const ReplaceJournal journal{.oldUrl = progress.oldUrl,
                                  .newUrl = progress.newUrl,
                                  .stagingUrl = progress.stagingUrl,
                                  .destUrl = progress.destUrl};
     const auto& directories = progress.directories;
-    if (auto written = journal._writeToDiskReplaceAt(log, services_.fileManager, journalUrl); !written) {
+    if (auto written = journal._writeToDiskReplaceAt(log, needs_.fileManager, journalUrl); !written) {
         log.write(logLevelError, replaceFunction, "Failed to write replace file: %s", written.error().text().c_str());
         // Where only its last sync failed it is there; nothing has moved, so it does no harm where it stays.
         const std::string name(journalUrl.lastPathComponent());
-        (void)services_.fileManager.disk().unlinkFile(directories.journals.get(), name.c_str());
+        (void)needs_.fileManager.disk().unlinkFile(directories.journals.get(), name.c_str());
         return written;
     }
     progress.journalUrl = journalUrl;
     progress.moved = &directories.old;
-    const auto moved = services_.fileManager.moveItem(directories.old.get(), progress.oldUrl, directories.staging.get(),
-                                                      progress.stagingUrl);
+    const auto moved = needs_.fileManager.moveItem(directories.old.get(), progress.oldUrl, directories.staging.get(),
+                                                   progress.stagingUrl);
     if (!moved)
         return oldNotMoved(moved.error());
     // A copy does not fail when only the source cannot go: two would be live.
-    if (*moved == ZORFileManager::Moved::byCopy && !services_.fileManager.itemDoesNotExistAtURL(progress.oldUrl))
+    if (*moved == ZORFileManager::Moved::byCopy && !needs_.fileManager.itemDoesNotExistAtURL(progress.oldUrl))
         return oldNotMoved(posixError(here, EBUSY, "%s is still there", progress.oldUrl.c_str()));
     progress.moved = &directories.dest;
     // A cut could leave the second of two moves without the first, with nothing else to keep their order.
-    if (const int ordered = services_.durability.between(directories.staging.get(), directories.dest.get());
+    if (const int ordered = needs_.moves.durability().between(directories.staging.get(), directories.dest.get());
         ordered < 0)
         return undoFirstMove(
             progress, posixError(here, -ordered, "sync of %s failed: %s", stagingUrl.c_str(), errorText(-ordered)));
     const bool transient = progress.oldWasTransient;
-    const auto removed = services_.cache.removeContainerForUser(request.userIdOld, request.classOld,
-                                                                &progress.oldRecord->identifier(), transient);
+    const auto removed = needs_.cache.removeContainerForUser(request.userIdOld, request.classOld,
+                                                             &progress.oldRecord->identifier(), transient);
     if (!removed)
         return makeError(log, here, ErrorCode::cacheRemoveFailed, &removed.error(), LogFlag::yes,
                          "Failed to remove from cache id: %s, class: %ld, transient: %d",
@@ -282,25 +264,25 @@ Result<void> ZORClientConnection::moveOldAway(const ReplaceRequest& request, Rep
     return {};
 }
 
-ZORError ZORClientConnection::undoFirstMove(ReplaceProgress& progress, const ZORError& cause) {
-    const Log& log = services_.log;
+ZORError Replace::undoFirstMove(Progress& progress, const ZORError& cause) {
+    const Log& log = needs_.log;
     const Here here{replaceFunction, __LINE__};
     const auto& directories = progress.directories;
-    const auto undone = services_.fileManager.moveItem(directories.staging.get(), progress.stagingUrl,
-                                                       directories.old.get(), progress.oldUrl);
+    const auto undone = needs_.fileManager.moveItem(directories.staging.get(), progress.stagingUrl,
+                                                    directories.old.get(), progress.oldUrl);
     if (undone) {
         progress.moved = &directories.old;
         return makeError(log, here, ErrorCode::oldNotMovedToStaging, &cause, LogFlag::yes,
                          "Failed to move old %s to staging %s", progress.oldUrl.c_str(), progress.stagingUrl.c_str());
     }
     progress.oldWaits = true;
-    (void)services_.cache.removeContainerForUser(progress.oldRecord->uid(), progress.oldRecord->containerClass(),
-                                                 &progress.oldRecord->identifier(), progress.oldWasTransient);
+    (void)needs_.cache.removeContainerForUser(progress.oldRecord->uid(), progress.oldRecord->containerClass(),
+                                              &progress.oldRecord->identifier(), progress.oldWasTransient);
     return makeError(log, here, ErrorCode::journalUnusable, &undone.error(), LogFlag::yes,
                      "Failed to recover replace move: %s to %s", progress.stagingUrl.c_str(), progress.oldUrl.c_str());
 }
 
-Result<void> ZORClientConnection::openDirectories(ReplaceProgress& progress, const FileURL& stagingUrl) {
+Result<void> Replace::openDirectories(Progress& progress, const FileURL& stagingUrl) {
     auto& directories = progress.directories;
     struct Wanted {
         FileDescriptor* descriptor;
@@ -315,26 +297,26 @@ Result<void> ZORClientConnection::openDirectories(ReplaceProgress& progress, con
         {&directories.dest, progress.destUrl, owner},
         {&directories.old, progress.oldUrl, owner},
         {&directories.staging, stagingUrl, ownerUnchanged},
-        {&directories.journals, services_.configuration.replaceDirectory().appendingFile("journal"), ownerUnchanged}};
+        {&directories.journals, needs_.configuration.replaceDirectory().appendingFile("journal"), ownerUnchanged}};
     constexpr std::size_t ofTheNewOne = 2;
     for (const Wanted& one : std::span(wanted).first(progress.oldRecord ? std::size(wanted) : ofTheNewOne))
-        *one.descriptor = TRY(services_.fileManager.openDirectoryOf(one.owner, one.url.deletingLastPathComponent()));
+        *one.descriptor = TRY(needs_.fileManager.openDirectoryOf(one.owner, one.url.deletingLastPathComponent()));
     return {};
 }
 
-Result<void> ZORClientConnection::putNewInPlace(const ReplaceRequest& request, ReplaceProgress& progress) {
-    const Log& log = services_.log;
+Result<void> Replace::putNewInPlace(const ReplaceRequest& request, Progress& progress) {
+    const Log& log = needs_.log;
     const Here here{replaceFunction, __LINE__};
     ZORMetadata& record = *progress.newRecord;
-    const auto moved = services_.fileManager.moveItem(progress.directories.fresh.get(), progress.newUrl,
-                                                      progress.directories.dest.get(), progress.destUrl);
+    const auto moved = needs_.fileManager.moveItem(progress.directories.fresh.get(), progress.newUrl,
+                                                   progress.directories.dest.get(), progress.destUrl);
     if (!moved)
         return notInPlace(progress, moved.error());
     progress.newUuidBefore.reset(); // the old UUID is its own from now on
     record.setDurable(false);
     const bool newWasTransient = record.transient();
-    const auto removed = services_.cache.removeContainerForUser(request.userIdNew, request.classNew,
-                                                                &record.identifier(), newWasTransient);
+    const auto removed =
+        needs_.cache.removeContainerForUser(request.userIdNew, request.classNew, &record.identifier(), newWasTransient);
     if (!removed)
         return makeError(log, here, ErrorCode::cacheRemoveFailed, &removed.error(), LogFlag::yes,
                          "Failed to remove from cache id: %s, class: %ld, transient: %d",
@@ -345,16 +327,16 @@ Result<void> ZORClientConnection::putNewInPlace(const ReplaceRequest& request, R
         const bool otherIdentifier =
             progress.oldRecord && progress.oldRecord->identifier() != record.identifier() && becomesLive;
         if (otherIdentifier)
-            (void)_setSandboxContainerMappingForUser(request.userIdOld, progress.oldRecord->identifier(),
-                                                     request.classOld, std::nullopt);
-        if ((becomesLive || !newWasTransient) &&
-            !_setSandboxContainerMappingForUser(request.userIdNew, record.identifier(), request.classNew,
-                                                becomesLive ? std::optional(progress.destUrl) : std::nullopt))
+            (void)needs_.mappings._setSandboxContainerMappingForUser(
+                request.userIdOld, progress.oldRecord->identifier(), request.classOld, std::nullopt);
+        if ((becomesLive || !newWasTransient) && !needs_.mappings._setSandboxContainerMappingForUser(
+                                                     request.userIdNew, record.identifier(), request.classNew,
+                                                     becomesLive ? std::optional(progress.destUrl) : std::nullopt))
             log.write(logLevelError, replaceFunction, "Failed to set container mapping in replace operation");
     }
     record.setTransient(progress.oldWasTransient);
-    const auto added = services_.cache.addContainerMetadata(progress.newRecord, request.userIdNew,
-                                                            ContainerPlace(progress.destUrl), progress.oldWasTransient);
+    const auto added = needs_.cache.addContainerMetadata(progress.newRecord, request.userIdNew,
+                                                         ContainerPlace(progress.destUrl), progress.oldWasTransient);
     if (!added)
         return makeError(log, here, ErrorCode::cacheAddFailed, &added.error(), LogFlag::yes,
                          "Failed to add to cache: %s, url: %s, transient: %d", ZOR_SHOWN(record.identifier()),
@@ -362,55 +344,46 @@ Result<void> ZORClientConnection::putNewInPlace(const ReplaceRequest& request, R
     return {};
 }
 
-int ZORClientConnection::orderBetween(const FileURL& changed, const FileURL& next) {
-    const auto first = services_.fileManager.resolver().openDirectory(changed);
-    const auto second = services_.fileManager.resolver().openDirectory(next);
-    if (!first || !second)
-        return -(first ? second.error() : first.error());
-    return services_.durability.between(first->get(), second->get());
-}
-
-void ZORClientConnection::recoverFromException(const ReplaceProgress& progress) {
-    ZORFileManager& fileManager = services_.fileManager;
+void Replace::recoverFromException(const Progress& progress) {
+    ZORFileManager& fileManager = needs_.fileManager;
     if (progress.oldUrl.empty() || progress.destUrl.empty() || !fileManager.itemDoesNotExistAtURL(progress.oldUrl) ||
         !fileManager.itemDoesNotExistAtURL(progress.destUrl))
         return;
-    if (services_.log.writes(logLevelDebug))
-        services_.log.write(logLevelDebug, replaceFunction, "Recovering from exception by moving: %s to %s",
-                            progress.stagingUrl.c_str(), progress.oldUrl.c_str());
+    if (needs_.log.writes(logLevelDebug))
+        needs_.log.write(logLevelDebug, replaceFunction, "Recovering from exception by moving: %s to %s",
+                         progress.stagingUrl.c_str(), progress.oldUrl.c_str());
     const auto moved = fileManager.moveItem(progress.directories.staging.get(), progress.stagingUrl,
                                             progress.directories.old.get(), progress.oldUrl);
     if (moved) {
         // Its record may have left the cache already. Should that fail, the next reading of its class finds it.
-        (void)services_.cache.addContainerMetadata(progress.oldRecord, progress.oldRecord->uid(),
-                                                   ContainerPlace(progress.oldUrl), progress.oldWasTransient);
+        (void)needs_.cache.addContainerMetadata(progress.oldRecord, progress.oldRecord->uid(),
+                                                ContainerPlace(progress.oldUrl), progress.oldWasTransient);
         return;
     }
-    makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::journalUnusable, &moved.error(), LogFlag::yes,
+    makeError(needs_.log, {replaceFunction, __LINE__}, ErrorCode::journalUnusable, &moved.error(), LogFlag::yes,
               "Failed to recover replace move: %s to %s", progress.stagingUrl.c_str(), progress.oldUrl.c_str());
     // The journal stays, and the next launch tries again: going on would let the clean-up take the old container.
     std::abort();
 }
 
-std::optional<ZORError> ZORClientConnection::cleanUpReplace(ReplaceProgress& progress,
-                                                            StartDeletionThread startDeletionThread) {
+std::optional<ZORError> Replace::cleanUpReplace(Progress& progress, StartDeletionThread startDeletionThread) {
     if (progress.newUuidBefore) {
         // It did not take the old one's place: it is again who it was. Should that fail, the file's next writing does
         // it.
         progress.newRecord->setUuid(*progress.newUuidBefore);
-        (void)progress.newRecord->writeMetadataToDiskWithError(services_.log, services_.fileManager);
+        (void)progress.newRecord->writeMetadataToDiskWithError(needs_.log, needs_.fileManager);
     }
     if (!progress.oldRecord || progress.journalUrl.empty())
         return std::nullopt;
     const auto& directories = progress.directories;
     const auto waits = [&] {
-        services_.waitingReplaces.add(
+        needs_.recovery.leave(
             {.journalUrl = progress.journalUrl, .oldUrl = progress.oldUrl, .destUrl = progress.destUrl});
     };
     const auto journalStays = [&](const ZORError& cause) {
         waits();
-        return makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &cause,
-                         LogFlag::yes, "Failed to remove replace file: %s", progress.journalUrl.c_str());
+        return makeError(needs_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &cause, LogFlag::yes,
+                         "Failed to remove replace file: %s", progress.journalUrl.c_str());
     };
     if (progress.oldWaits) {
         waits();
@@ -419,17 +392,18 @@ std::optional<ZORError> ZORClientConnection::cleanUpReplace(ReplaceProgress& pro
     // The moves are on the disk before the journal can be gone. Where that cannot be, it stays for the next request or
     // launch, which finds what has moved.
     const int ordered =
-        progress.moved ? services_.durability.between(progress.moved->get(), directories.journals.get()) : 0;
+        progress.moved ? needs_.moves.durability().between(progress.moved->get(), directories.journals.get()) : 0;
     if (ordered < 0)
         return journalStays(posixError({replaceFunction, __LINE__}, -ordered, "sync of %s failed: %s",
                                        progress.destUrl.deletingLastPathComponent().c_str(), errorText(-ordered)));
     std::optional<ZORError> failed;
-    if (const auto moved = _moveItemAtURLToDeathRow(progress.stagingUrl, StartDeletionThread::no); !moved)
-        failed = makeError(services_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
+    if (const auto moved = needs_.deathRow._moveItemAtURLToDeathRow(progress.stagingUrl, StartDeletionThread::no);
+        !moved)
+        failed = makeError(needs_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
                            LogFlag::yes, "Failed to remove staging dir: %s", progress.stagingUrl.c_str());
     const std::string journalName(progress.journalUrl.lastPathComponent());
-    if (const auto moved = _moveItemAtURLToDeathRow(progress.journalUrl, startDeletionThread);
-        !moved && services_.fileManager.disk().unlinkFile(directories.journals.get(), journalName.c_str()) < 0)
+    if (const auto moved = needs_.deathRow._moveItemAtURLToDeathRow(progress.journalUrl, startDeletionThread);
+        !moved && needs_.fileManager.disk().unlinkFile(directories.journals.get(), journalName.c_str()) < 0)
         failed = journalStays(moved.error());
     return failed;
 }

@@ -1,17 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// What a launch makes of the replaces that were under way when the last daemon ended.
-//
-// A journal says where the directories of a replace were and were to go; which of them are there says how far it came.
-// `states` is the table of that. Each row's recovery is one move at the most. What its state rests on, that move or one
-// which the ended daemon made and had not synced, is on the disk before the journal can be gone: a stop in between
-// leaves another row of the table.
-//
-// A journal that cannot be settled or read stays and waits (`SettleReplaces.cc`).
-//
-// At a launch it runs on the thread that starts the daemon, before any client and before anything is cached; later
-// under the all-identifiers lock, for one journal.
-#include "operations/StoreServices.h"
-#include "operations/ZORClientConnection.h"
+#include "operations/ReplaceRecovery.h"
+
 #include "store/ReplaceJournal.h"
 
 #include <algorithm>
@@ -86,28 +75,28 @@ const State* stateOf(ZORFileManager& fileManager, const ReplaceJournal& journal)
 
 } // namespace
 
-Result<void> ZORClientConnection::_recoverFromReplaceOperationsWithError() {
+Result<void> ReplaceRecovery::_recoverFromReplaceOperationsWithError() {
     // Until all of them have been looked at, whoever asks for what one may name lists them again: want of memory, or a
     // stop, may end this anywhere.
-    services_.waitingReplaces.setUnlisted(true);
-    const FileURL replace = services_.configuration.replaceDirectory();
-    const auto items = services_.fileManager.urlsForItemsInDirectoryAtURL(replace);
+    waiting_.setUnlisted(true);
+    const FileURL replace = needs_.configuration.replaceDirectory();
+    const auto items = needs_.fileManager.urlsForItemsInDirectoryAtURL(replace);
     if (!items) {
         if (!items.error().isPosix(ENOENT))
-            services_.log.write(logLevelError, recoverFunction, "Failed to get items at replace URL%s : %s",
-                                replace.c_str(), items.error().text().c_str());
-        services_.waitingReplaces.setUnlisted(!items.error().isPosix(ENOENT));
+            needs_.log.write(logLevelError, recoverFunction, "Failed to get items at replace URL%s : %s",
+                             replace.c_str(), items.error().text().c_str());
+        waiting_.setUnlisted(!items.error().isPosix(ENOENT));
         return {};
     }
     // A journal has its name for itself alone, so no later write removes what a stop left of this one's.
-    for (const FileURL& leftover : services_.fileManager.writeLeftoversInDirectoryAtURL(replace))
-        (void)_moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
+    for (const FileURL& leftover : needs_.fileManager.writeLeftoversInDirectoryAtURL(replace))
+        (void)needs_.deathRow._moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
     std::optional<ZORError> unread;
     std::optional<ZORError> stopped;
     for (const FileURL& item : *items) {
-        if (!services_.setup.goOn())
+        if (!needs_.report.goOn())
             return {};
-        auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(services_.log, services_.fileManager, item);
+        auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(needs_.log, needs_.fileManager, item);
         // It stays, with what it names in staging; the others do not hang on it.
         const bool unreadable = !journal && ReplaceJournal::mayStillBeRead(journal.error());
         if (unreadable)
@@ -117,42 +106,58 @@ Result<void> ZORClientConnection::_recoverFromReplaceOperationsWithError() {
                 stopped = std::move(recovered).error();
         // Found again by the next launch; until then whoever asks for what it names tries.
         if (unreadable || stopped)
-            services_.waitingReplaces.add({.journalUrl = item,
-                                           .oldUrl = journal ? journal->oldUrl : FileURL(),
-                                           .destUrl = journal ? journal->destUrl : FileURL()});
+            waiting_.add({.journalUrl = item,
+                          .oldUrl = journal ? journal->oldUrl : FileURL(),
+                          .destUrl = journal ? journal->destUrl : FileURL()});
     }
-    services_.waitingReplaces.setUnlisted(false);
+    waiting_.setUnlisted(false);
     if (stopped)
         return std::move(*stopped);
     return unread ? Result<void>(std::move(*unread)) : Result<void>();
 }
 
-Result<void> ZORClientConnection::recoverReplace(const FileURL& journalUrl, ReplaceJournal* journal) {
-    const Log& log = services_.log;
+std::optional<std::set<std::string, std::less<>>> ReplaceRecovery::stagedByJournals() {
+    std::set<std::string, std::less<>> names;
+    const auto items = needs_.fileManager.urlsForItemsInDirectoryAtURL(needs_.configuration.replaceDirectory());
+    if (!items && !items.error().isPosix(ENOENT))
+        return std::nullopt;
+    // There are some only when the recovery stopped, perhaps because they could not be read: their names tell.
+    for (const FileURL& item : items.value_or(std::vector<FileURL>()))
+        names.emplace(ReplaceJournal::stagingNameFor(item));
+    return names;
+}
+
+std::size_t ReplaceRecovery::journalCount() {
+    const auto items = needs_.fileManager.urlsForItemsInDirectoryAtURL(needs_.configuration.replaceDirectory());
+    return items ? items->size() : 0;
+}
+
+Result<void> ReplaceRecovery::recoverReplace(const FileURL& journalUrl, ReplaceJournal* journal) {
+    const Log& log = needs_.log;
     if (journal) {
-        journal->moveToRoot(services_.fileManager.resolver().root().canonicalPath(),
-                            services_.configuration.stagingDirectory());
+        journal->moveToRoot(needs_.fileManager.resolver().root().canonicalPath(),
+                            needs_.configuration.stagingDirectory());
         if (log.writes(logLevelDebug))
             log.write(logLevelDebug, recoverFunction, "Doing a replace of %s with info: %s", journalUrl.c_str(),
                       journal->text().c_str());
         TRY(applyReplaceJournal(*journal));
     }
-    if (const auto moved = _moveItemAtURLToDeathRow(journalUrl, StartDeletionThread::no); !moved)
+    if (const auto moved = needs_.deathRow._moveItemAtURLToDeathRow(journalUrl, StartDeletionThread::no); !moved)
         return makeError(log, {recoverFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
                          LogFlag::yes, "Failed to remove replace file at %s", journalUrl.c_str());
-    services_.waitingReplaces.remove(journalUrl);
+    waiting_.remove(journalUrl);
     return {};
 }
 
-Result<void> ZORClientConnection::applyReplaceJournal(const ReplaceJournal& journal) {
-    const Log& log = services_.log;
+Result<void> ReplaceRecovery::applyReplaceJournal(const ReplaceJournal& journal) {
+    const Log& log = needs_.log;
     const auto failed = [&](const ZORError* cause) {
         return makeError(log, {recoverFunction, __LINE__}, ErrorCode::journalUnusable, cause, LogFlag::yes,
                          "Failed to recover replace move: %s to %s", journal.stagingUrl.c_str(),
                          journal.oldUrl.c_str());
     };
     // What cannot be examined may be there or not. The journal waits for a launch that can tell.
-    const State* const state = stateOf(services_.fileManager, journal);
+    const State* const state = stateOf(needs_.fileManager, journal);
     if (!state)
         return failed(nullptr);
     log.write(state->logLevel, recoverFunction, "A replace of %s had stopped: %s", journal.oldUrl.c_str(),
@@ -162,16 +167,15 @@ Result<void> ZORClientConnection::applyReplaceJournal(const ReplaceJournal& jour
             log.write(logLevelDebug, recoverFunction, "Recovering from failed replace by moving: %s to %s",
                       journal.stagingUrl.c_str(), journal.oldUrl.c_str());
         const auto moved = [&]() -> Result<void> {
-            ZORFileManager& fileManager = services_.fileManager;
+            ZORFileManager& fileManager = needs_.fileManager;
             const FileURL place = journal.oldUrl.deletingLastPathComponent();
-            const auto owner = services_.configuration.ownerOfClassDirectory(place);
+            const auto owner = needs_.configuration.ownerOfClassDirectory(place);
             if (!owner)
                 return posixError({recoverFunction, __LINE__}, EINVAL, "%s holds no containers", place.c_str());
             const auto from =
                 TRY(fileManager.openDirectoryOf(ownerUnchanged, journal.stagingUrl.deletingLastPathComponent()));
             const auto to = TRY(fileManager.openDirectoryOf(*owner, place));
-            TRY(fileManager.moveItem(from.get(), journal.stagingUrl, to.get(), journal.oldUrl,
-                                     services_.setup.check()));
+            TRY(fileManager.moveItem(from.get(), journal.stagingUrl, to.get(), journal.oldUrl, needs_.report.check()));
             return {};
         }();
         if (!moved)
@@ -180,7 +184,7 @@ Result<void> ZORClientConnection::applyReplaceJournal(const ReplaceJournal& jour
     if (!state->settled)
         return {};
     const FileURL place = (journal.*state->settled).deletingLastPathComponent();
-    if (orderBetween(place, services_.configuration.replaceDirectory()) < 0)
+    if (needs_.moves.orderBetween(place, needs_.configuration.replaceDirectory()) < 0)
         return failed(nullptr);
     return {};
 }

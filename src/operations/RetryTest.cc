@@ -1,21 +1,19 @@
 // SPDX-License-Identifier: Apache-2.0
-// For tests of clients: the daemon ends in the middle of a request as often as it is told, then the request succeeds.
-// The count is kept in the info of a container of its own, so it survives each end.
-#include "operations/StoreServices.h"
-#include "operations/ZORClientConnection.h"
+#include "operations/RetryTest.h"
 
 #include <unistd.h>
 
 namespace zor {
 
-Result<void> ZORClientConnection::retryTestForUser(std::uint32_t userId, std::uint64_t numCrashes) {
-    return services_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
+Result<void> RetryTest::retryTestForUser(const Caller& caller, std::uint32_t userId, std::uint64_t numCrashes) {
+    return needs_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
         constexpr const char* function = "retryTestForUser";
         static const std::string identifier = "com.veltra.retryTest";
         static const std::string counterKey = "CrashCounter";
-        const Log& log = services_.log;
-        const auto found = createOrLookupContainerForUser(userId, &identifier, ContainerClass::dataApplication,
-                                                          {.createIfNecessary = true, .transient = false});
+        const Log& log = needs_.log;
+        const auto found =
+            needs_.creation.createOrLookupContainerForUser(caller, userId, &identifier, ContainerClass::dataApplication,
+                                                           {.createIfNecessary = true, .transient = false});
         if (!found) {
             log.write(logLevelError, function,
                       "Failed to create or lookup lookup existing container for retry test: %s", identifier.c_str());
@@ -26,7 +24,7 @@ Result<void> ZORClientConnection::retryTestForUser(std::uint32_t userId, std::ui
                                        .identifier = identifier,
                                        .containerClass = ContainerClass::dataApplication};
         std::uint64_t remaining = numCrashes;
-        if (const auto stored = infoValueForKey(&counterKey, address, UseLocking::yes)) {
+        if (const auto stored = needs_.infoValues.infoValueForKey(&counterKey, address)) {
             const auto counter = static_cast<std::uint32_t>(stored->asUnsigned().value_or(0));
             // A 0 stays behind when the last staging failed: nothing is left to be counted down.
             remaining = counter == 0 ? 0 : counter - 1;
@@ -34,13 +32,13 @@ Result<void> ZORClientConnection::retryTestForUser(std::uint32_t userId, std::ui
         log.write(logLevelError, function, "Crashes Remaining in retry test: %llu",
                   static_cast<unsigned long long>(remaining));
         const plist::Value value(remaining);
-        TRY(setInfoValue(&value, &counterKey, address, UseLocking::yes));
+        TRY(needs_.infoValues.setInfoValue(caller, &value, &counterKey, address));
         if (remaining != 0) {
             log.write(logLevelError, function, "Crashing");
             ::_exit(0);
         }
-        auto staged = stageForDeleteContainersWithUsers(
-            DeletionBatch::of(userId, found->uuid, identifier, ContainerClass::dataApplication), UseLocking::yes);
+        auto staged = needs_.deletion.stageForDeleteContainersWithUsers(
+            DeletionBatch::of(userId, found->uuid, identifier, ContainerClass::dataApplication));
         if (staged)
             log.write(logLevelError, function, "Returning Successfully");
         else

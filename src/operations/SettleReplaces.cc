@@ -7,8 +7,7 @@
 // A try is the launch's own recovery of that journal, so it leaves what that leaves (`ReplaceRecovery.cc`). It syncs
 // under the lock where the file system keeps no order: that is rare, and nobody may act on half of it.
 #include "fs/AtomicFile.h"
-#include "operations/StoreServices.h"
-#include "operations/ZORClientConnection.h"
+#include "operations/ReplaceRecovery.h"
 #include "store/ContainerLayout.h"
 #include "store/Names.h"
 #include "store/ReplaceJournal.h"
@@ -21,15 +20,15 @@
 
 namespace zor {
 
-bool ZORClientConnection::mayComeBack(const FileURL& staged, const WaitingReplaces::Waiting& waiting,
-                                      const ContainerAtStake& atStake) {
-    const fs::PathResolver& resolver = services_.fileManager.resolver();
+bool ReplaceRecovery::mayComeBack(const FileURL& staged, const WaitingReplaces::Waiting& waiting,
+                                  const ContainerAtStake& atStake) {
+    const fs::PathResolver& resolver = needs_.fileManager.resolver();
     if (!atStake.place.empty() && (atStake.place == waiting.oldUrl || atStake.place == waiting.destUrl))
         return true;
     const auto parent = resolver.openParent(staged);
     const int failure = parent ? 0 : parent.error();
     const auto bytes =
-        parent ? fs::readOwnedFile(services_.fileManager.disk(), parent->directory.get(),
+        parent ? fs::readOwnedFile(needs_.fileManager.disk(), parent->directory.get(),
                                    (parent->name + "/" + names::metadataFile).c_str(), fs::metadataFileBytesMax)
                : std::unexpected(failure);
     if (bytes) {
@@ -44,8 +43,8 @@ bool ZORClientConnection::mayComeBack(const FileURL& staged, const WaitingReplac
     if (!waiting.oldUrl.empty()) {
         const FileURL place = waiting.oldUrl.deletingLastPathComponent();
         return std::ranges::any_of(std::array{false, true}, [&](bool transient) {
-            return services_.configuration.containerDirectoryURLForUser(atStake.userId, atStake.containerClass,
-                                                                        transient) == place;
+            return needs_.configuration.containerDirectoryURLForUser(atStake.userId, atStake.containerClass,
+                                                                     transient) == place;
         });
     }
     struct stat status{};
@@ -55,65 +54,63 @@ bool ZORClientConnection::mayComeBack(const FileURL& staged, const WaitingReplac
     return ::geteuid() != 0 || status.st_uid == (owner == ownerUnchanged ? ::geteuid() : owner);
 }
 
-Result<bool> ZORClientConnection::settleReplaces(const ContainerAtStake& atStake) {
-    WaitingReplaces& waiting = services_.waitingReplaces;
-    if (waiting.none())
+Result<bool> ReplaceRecovery::settleReplaces(const ContainerAtStake& atStake, const AllIdentifiersWriteLock& /*held*/) {
+    if (waiting_.none())
         return false;
-    if (waiting.unlisted())
+    if (waiting_.unlisted())
         TRY(listReplacesAgain(atStake));
     bool settled = false;
-    for (const WaitingReplaces::Waiting& one : waiting.all()) {
-        const FileURL staged = services_.configuration.stagingDirectory().appendingDirectory(
-            ReplaceJournal::stagingNameFor(one.journalUrl));
+    for (const WaitingReplaces::Waiting& one : waiting_.all()) {
+        const FileURL staged =
+            needs_.configuration.stagingDirectory().appendingDirectory(ReplaceJournal::stagingNameFor(one.journalUrl));
         if (!mayComeBack(staged, one, atStake))
             continue;
-        auto journal =
-            ReplaceJournal::_readAndValidateReplaceFileAtUrl(services_.log, services_.fileManager, one.journalUrl);
+        auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(needs_.log, needs_.fileManager, one.journalUrl);
         if (!journal && ReplaceJournal::mayStillBeRead(journal.error()))
             return std::move(journal).error();
         const auto recovered = recoverReplace(one.journalUrl, journal ? &*journal : nullptr);
         // What came back is not in it; also a try that failed may have brought it back, and only not rid the journal.
-        services_.cache.dropAll();
+        needs_.cache.dropAll();
         TRY(recovered);
         // A replace that was done; one that was undone has left nothing there.
-        (void)_moveItemAtURLToDeathRow(staged, StartDeletionThread::yes);
+        (void)needs_.deathRow._moveItemAtURLToDeathRow(staged, StartDeletionThread::yes);
         settled = true;
     }
     return settled;
 }
 
-Result<void> ZORClientConnection::listReplacesAgain(const ContainerAtStake& atStake) {
-    const auto journals =
-        services_.fileManager.urlsForItemsInDirectoryAtURL(services_.configuration.replaceDirectory());
+Result<void> ReplaceRecovery::listReplacesAgain(const ContainerAtStake& atStake) {
+    const auto journals = needs_.fileManager.urlsForItemsInDirectoryAtURL(needs_.configuration.replaceDirectory());
     if (journals) {
         for (const FileURL& url : *journals)
-            services_.waitingReplaces.add({.journalUrl = url});
-        services_.waitingReplaces.setUnlisted(false);
+            waiting_.add({.journalUrl = url});
+        waiting_.setUnlisted(false);
         return {};
     }
-    const FileURL staging = services_.configuration.stagingDirectory();
-    const auto staged = services_.fileManager.urlsForItemsInDirectoryAtURL(staging);
+    const FileURL staging = needs_.configuration.stagingDirectory();
+    const auto staged = needs_.fileManager.urlsForItemsInDirectoryAtURL(staging);
     const bool mayBeOne =
         !staged || std::ranges::any_of(*staged, [&](const FileURL& url) { return mayComeBack(url, {}, atStake); });
     if (!mayBeOne)
         return {};
-    return makeError(services_.log, {"settleReplaces", __LINE__}, ErrorCode::journalUnusable,
+    return makeError(needs_.log, {"settleReplaces", __LINE__}, ErrorCode::journalUnusable,
                      staged ? &journals.error() : &staged.error(), LogFlag::yes,
                      "A container of %s in %s may come back from %s, and the journals cannot be listed",
                      ZOR_SHOWN(atStake.identifier), className(atStake.containerClass), staging.c_str());
 }
 
-Result<std::shared_ptr<ZORMetadata>> ZORClientConnection::settledContainer(std::uint32_t userId,
-                                                                           ContainerClass containerClass,
-                                                                           const std::string* identifier,
-                                                                           const UUID& uuid) {
+Result<std::shared_ptr<ZORMetadata>> ReplaceRecovery::settledContainer(std::uint32_t userId,
+                                                                       ContainerClass containerClass,
+                                                                       const std::string* identifier, const UUID& uuid,
+                                                                       const AllIdentifiersWriteLock& lock) {
     const std::string uuidString = uuid.string();
-    auto record = TRY(services_.cache.containerForUser(userId, containerClass, identifier, uuidString));
+    auto record = TRY(needs_.cache.containerForUser(userId, containerClass, identifier, uuidString));
     const bool settled = TRY(settleReplaces({.userId = userId,
                                              .containerClass = containerClass,
                                              .identifier = identifier ? *identifier : std::string(),
-                                             .place = record ? record->url() : FileURL()}));
-    return settled ? services_.cache.containerForUser(userId, containerClass, identifier, uuidString) : record;
+                                             .place = record ? record->url() : FileURL()},
+                                            lock));
+    return settled ? needs_.cache.containerForUser(userId, containerClass, identifier, uuidString) : record;
 }
 
 } // namespace zor

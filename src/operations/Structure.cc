@@ -1,14 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// Two repairs of a container: its standard subdirectories made again, and a new name for its directory. Neither gives a
-// directory away because it has a wanted name: the container and each subdirectory are judged on the descriptor used.
-//
-// A subdirectory that is made anew has the protection class that is recorded for the container; while the device is
-// locked, one that lock takes away cannot be given, and the repair fails.
-//
-// A stop leaves some subdirectories made, one perhaps not yet its owner's, until the repair is repeated; or the
-// container under its old or its new name; a mapping that then points to nothing is removed at the next launch.
-#include "operations/StoreServices.h"
-#include "operations/ZORClientConnection.h"
+#include "operations/Structure.h"
+
 #include "store/ContainerLayout.h"
 
 #include <map>
@@ -19,29 +11,29 @@ namespace zor {
 
 using platform::FileDescriptor;
 
-Result<void> ZORClientConnection::recreateDefaultStructureForUser(const ContainerAddress& address) {
-    return services_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
+Result<void> Structure::recreateDefaultStructureForUser(const ContainerAddress& address) {
+    return needs_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
         constexpr const char* function = "recreateDefaultStructureForUser";
-        TRY(checkAddress(function, address));
+        TRY(checkAddress(needs_.log, function, address));
         std::vector<FileURL> changed;
         {
-            const IdentifierLock lock(services_.locks, address.uuid->string(), LockMode::writing);
-            const auto record = TRY(knownContainer(function, address));
+            const IdentifierWriteLock lock(needs_.locks, address.lockName());
+            const auto record = TRY(knownContainer(needs_.log, needs_.cache, function, address, lock));
             changed.push_back(record->url());
             TRY(makeSubdirectories(layoutOf(address.containerClass, address.userId),
                                    record->recordedProtectionClass().value_or(protectionClassUnchanged), changed));
         }
-        if (const auto failed = syncDirectories(changed))
-            return makeError(services_.log, {function, __LINE__}, ErrorCode::subdirectoryFailed, &*failed, LogFlag::yes,
+        if (const auto failed = needs_.moves.syncDirectories(changed))
+            return makeError(needs_.log, {function, __LINE__}, ErrorCode::subdirectoryFailed, &*failed, LogFlag::yes,
                              "Failed to create sub-dir at %s%s", changed.front().c_str(), "");
         return {};
     });
 }
 
-Result<void> ZORClientConnection::makeSubdirectories(const ContainerLayout& layout, int protectionClass,
-                                                     std::vector<FileURL>& changed) {
+Result<void> Structure::makeSubdirectories(const ContainerLayout& layout, int protectionClass,
+                                           std::vector<FileURL>& changed) {
     const FileURL container = changed.front();
-    ZORFileManager& fileManager = services_.fileManager;
+    ZORFileManager& fileManager = needs_.fileManager;
     // Each is reached from the one that was judged: what has its name by then may be another's.
     std::map<std::string_view, FileDescriptor> open;
     const auto make = [&](std::string_view path) -> Result<FileDescriptor> {
@@ -62,7 +54,7 @@ Result<void> ZORClientConnection::makeSubdirectories(const ContainerLayout& layo
         changed.push_back(container.appendingDirectory(subdirectory));
         auto made = make(subdirectory);
         if (!made)
-            return makeError(services_.log, {"_createSubDirectories", __LINE__}, ErrorCode::subdirectoryFailed,
+            return makeError(needs_.log, {"_createSubDirectories", __LINE__}, ErrorCode::subdirectoryFailed,
                              &made.error(), LogFlag::yes, "Failed to create sub-dir at %s%s", container.c_str(),
                              subdirectory);
         open.emplace(subdirectory, std::move(*made));
@@ -70,51 +62,52 @@ Result<void> ZORClientConnection::makeSubdirectories(const ContainerLayout& layo
     return {};
 }
 
-Result<void> ZORClientConnection::regenerateDirectoryUUIDForUser(const ContainerAddress& address) {
-    return services_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
+Result<void> Structure::regenerateDirectoryUUIDForUser(const ContainerAddress& address) {
+    return needs_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
         constexpr const char* function = "regenerateDirectoryUUIDForUser";
-        TRY(checkAddress(function, address));
+        TRY(checkAddress(needs_.log, function, address));
         FileURL newUrl;
         std::shared_ptr<ZORMetadata> renamed;
-        if (!services_.waitingReplaces.none()) {
-            const AllIdentifiersLock lock(services_.locks, LockMode::writing);
-            (void)TRY(settledContainer(address.userId, address.containerClass,
-                                       address.identifier ? &*address.identifier : nullptr, *address.uuid));
+        if (!needs_.recovery.noneWaits()) {
+            const AllIdentifiersWriteLock lock(needs_.locks);
+            (void)TRY(needs_.recovery.settledContainer(address.userId, address.containerClass,
+                                                       address.identifier ? &*address.identifier : nullptr,
+                                                       *address.uuid, lock));
         }
         {
-            const IdentifierLock lock(services_.locks, address.uuid->string(), LockMode::writing);
-            const auto record = TRY(knownContainer(function, address));
+            const IdentifierWriteLock lock(needs_.locks, address.lockName());
+            const auto record = TRY(knownContainer(needs_.log, needs_.cache, function, address, lock));
             const FileURL oldUrl = record->url();
             const FileURL place = oldUrl.deletingLastPathComponent();
             newUrl = place.appendingDirectory(UUID::random().string());
             const auto moved = [&]() -> Result<void> {
                 const std::uint32_t owner =
                     ZORGlobalConfiguration::ownerOfClassDirectory(address.containerClass, address.userId);
-                const auto directory = TRY(services_.fileManager.openDirectoryOf(owner, place));
-                TRY(services_.fileManager.openDirectoryOf(owner, oldUrl));
-                TRY(services_.fileManager.moveItem(directory.get(), oldUrl, directory.get(), newUrl));
+                const auto directory = TRY(needs_.fileManager.openDirectoryOf(owner, place));
+                TRY(needs_.fileManager.openDirectoryOf(owner, oldUrl));
+                TRY(needs_.fileManager.moveItem(directory.get(), oldUrl, directory.get(), newUrl));
                 return {};
             }();
             if (!moved)
-                return makeError(services_.log, {function, __LINE__}, ErrorCode::directoryNotRenamed, &moved.error(),
+                return makeError(needs_.log, {function, __LINE__}, ErrorCode::directoryNotRenamed, &moved.error(),
                                  LogFlag::yes, "Failed to move dir: %s to new UUID dir: %s", oldUrl.c_str(),
                                  newUrl.c_str());
             const bool transient = record->transient(); // the mapping is the live one's
             if (isPerUserClass(address.containerClass) && !transient &&
-                !_setSandboxContainerMappingForUser(address.userId, record->identifier(), address.containerClass,
-                                                    newUrl))
-                services_.log.write(logLevelError, function, "Failed to set container mapping in regenerate operation");
+                !needs_.mappings._setSandboxContainerMappingForUser(address.userId, record->identifier(),
+                                                                    address.containerClass, newUrl))
+                needs_.log.write(logLevelError, function, "Failed to set container mapping in regenerate operation");
             record->setDurable(false);
             const auto added =
-                services_.cache.addContainerMetadata(record, address.userId, ContainerPlace(newUrl), transient);
+                needs_.cache.addContainerMetadata(record, address.userId, ContainerPlace(newUrl), transient);
             if (!added)
-                return makeError(services_.log, {function, __LINE__}, ErrorCode::cacheAddFailed, &added.error(),
+                return makeError(needs_.log, {function, __LINE__}, ErrorCode::cacheAddFailed, &added.error(),
                                  LogFlag::yes, "Failed to add to cache: %s, url: %s, transient: %d",
                                  ZOR_SHOWN(record->identifier()), newUrl.c_str(), transient);
             renamed = record;
         }
-        if (const auto failed = syncDirectories({newUrl.deletingLastPathComponent()}))
-            return notLasting(function, ErrorCode::directoryNotRenamed, newUrl, *failed);
+        if (const auto failed = needs_.moves.syncDirectories({newUrl.deletingLastPathComponent()}))
+            return needs_.moves.notLasting(function, ErrorCode::directoryNotRenamed, newUrl, *failed);
         renamed->setDurable(true);
         return {};
     });

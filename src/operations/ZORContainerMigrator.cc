@@ -2,17 +2,12 @@
 #include "operations/ZORContainerMigrator.h"
 
 #include "base/UserIdentity.h"
-#include "fs/DictionaryFile.h"
 #include "fs/Hidden.h"
-#include "operations/StoreServices.h"
-#include "operations/ZORClientConnection.h"
 #include "store/Names.h"
-#include "store/ZORWhitelist.h"
 
 #include <algorithm>
 #include <array>
 #include <cerrno>
-#include <ctime>
 
 namespace zor {
 
@@ -21,19 +16,9 @@ namespace {
 constexpr const char* whitelistOperation = "-[ZORContainerMigrator performWhitelistMigrationWithError:]";
 constexpr const char* migrationFunction = "performMigrationWithError";
 constexpr const char* whitelistFunction = "performWhitelistMigrationWithError";
-constexpr std::size_t markerBytesMax = 4096;
 
 constexpr std::array bundleClasses = {ContainerClass::bundleApplication, ContainerClass::bundleKolvexPlugin,
                                       ContainerClass::bundleVPNPlugin, ContainerClass::bundleFramework};
-
-std::string currentTime() {
-    const std::time_t now = std::time(nullptr);
-    std::tm parts{};
-    ::gmtime_r(&now, &parts);
-    char text[64];
-    (void)std::strftime(text, sizeof text, "%Y-%m-%d %H:%M:%S +0000", &parts);
-    return text;
-}
 
 /// Of a listing: there is a link, or a file, on the way or in the directory's place.
 bool isMisshapen(const ZORError& error) {
@@ -53,39 +38,13 @@ long long code(const ZORError& error) {
 
 } // namespace
 
-void ZORContainerMigrator::writeMigrationFileToDiskWithName(std::string_view name, const FileURL& directory) {
-    const std::string version = systemVersion_.buildVersion();
-    const plist::Dictionary marker{{"ZORMigrationVersionNumber", version.empty() ? "Unknown" : version},
-                                   {"ZORMigrationTime", currentTime()}};
-    const auto written = writeToURL(marker, directory.appendingFile(name), writeAtomically | writeWithoutProtection,
-                                    markerBytesMax, services_.fileManager);
-    const std::string shown(name);
-    if (written)
-        services_.log.write(logLevelNotice, __func__, "Migration successfully completed for %s", shown.c_str());
-    else
-        services_.log.write(logLevelError, __func__, "Failed to write migration file %s : %s", shown.c_str(),
-                            written.error().text().c_str());
-}
-
-void ZORContainerMigrator::writeMigrationFileToDiskWithName(std::string_view name) {
-    writeMigrationFileToDiskWithName(name, services_.configuration.libraryDirectory());
-}
-
-bool ZORContainerMigrator::existsMigrationFileWithName(std::string_view name) {
-    return services_.fileManager.itemExistsAtURL(services_.configuration.libraryDirectory().appendingFile(name));
-}
-
-bool ZORContainerMigrator::isDue(std::string_view name) {
-    return services_.fileManager.itemDoesNotExistAtURL(services_.configuration.libraryDirectory().appendingFile(name));
-}
-
 // The bundles of an older system.
 
 ZORContainerMigrator::Outcome ZORContainerMigrator::performMigrationWithError() {
-    const Log& log = services_.log;
-    const FileURL former = services_.configuration.formerBundleDirectory();
-    const FileURL bundles = services_.configuration.bundleDirectory();
-    if (!isDue(names::bundleMigrationMarker))
+    const Log& log = needs_.log;
+    const FileURL former = needs_.configuration.formerBundleDirectory();
+    const FileURL bundles = needs_.configuration.bundleDirectory();
+    if (!needs_.markers.isDue(names::bundleMigrationMarker))
         return {};
     if (auto hidden = cannotLook(former))
         return {.succeeded = false, .error = std::move(hidden)};
@@ -103,11 +62,12 @@ ZORContainerMigrator::Outcome ZORContainerMigrator::performMigrationWithError() 
         adoptBundlesOfClass(containerClass, count);
     log.write(logLevelNotice, migrationFunction, "Changing ownership of bundle container content. %llu errors so far",
               static_cast<unsigned long long>(count.errors));
-    auto owned = services_.fileManager.standardizeOwnershipAtURL(
-        bundles, services_.configuration.users().installer, services_.configuration.users().installer,
-        services_.configuration.users().first, services_.setup.check());
+    auto owned = needs_.fileManager.standardizeOwnershipAtURL(
+        bundles, needs_.configuration.users().installer, needs_.configuration.users().installer,
+        needs_.configuration.users().first, needs_.report.check());
     if (owned)
-        if (const int failure = orderBeforeMarker(bundles); failure < 0)
+        if (const int failure = needs_.moves.orderBetween(bundles, needs_.configuration.libraryDirectory());
+            failure < 0)
             owned = posixError({migrationFunction, __LINE__}, -failure, "sync of %s failed: %s", bundles.c_str(),
                                errorText(-failure));
     if (!owned)
@@ -125,62 +85,62 @@ ZORContainerMigrator::Outcome ZORContainerMigrator::performMigrationWithError() 
         return {.succeeded = true, .error = std::move(count.last), .migrated = count.migrated};
     }
     log.write(logLevelNotice, migrationFunction, "Successful bundle migration. Writing marker file.");
-    writeMigrationFileToDiskWithName(names::bundleMigrationMarker);
+    needs_.markers.writeMigrationFileToDiskWithName(names::bundleMigrationMarker);
     return {.succeeded = true, .error = std::move(count.last), .migrated = count.migrated};
 }
 
 std::optional<ZORError> ZORContainerMigrator::cannotLook(const FileURL& former) {
     struct stat status{};
-    const fs::PathResolver& resolver = services_.fileManager.resolver();
+    const fs::PathResolver& resolver = needs_.fileManager.resolver();
     if (resolver.status(former, status) != ENOENT)
         return std::nullopt;
-    const auto hider = fs::hiddenBy(resolver, services_.fileManager.disk(), former);
+    const auto hider = fs::hiddenBy(resolver, needs_.fileManager.disk(), former);
     if (hider)
         return posixError({migrationFunction, __LINE__}, ENOKEY, "An encryption whose key is away hides what is in %s",
                           hider->c_str());
-    if (services_.configuration.homeOf(services_.configuration.users().first)->look().state == UserHome::State::missing)
+    if (needs_.configuration.homeOf(needs_.configuration.users().first)->look().state == UserHome::State::missing)
         return posixError({migrationFunction, __LINE__}, ENOENT, "The home of user %u is not there",
-                          services_.configuration.users().first);
+                          needs_.configuration.users().first);
     return std::nullopt;
 }
 
 bool ZORContainerMigrator::mayHoldBundles(const FileURL& former) {
     // Another's directory that its owner named so holds none.
-    if (const auto judged = services_.fileManager.openDirectoryOf(services_.configuration.users().first, former);
+    if (const auto judged = needs_.fileManager.openDirectoryOf(needs_.configuration.users().first, former);
         !judged && judged.error().isPosix(EPERM)) {
-        services_.log.write(logLevelError, migrationFunction, "%s", judged.error().text().c_str());
+        needs_.log.write(logLevelError, migrationFunction, "%s", judged.error().text().c_str());
         return false;
     }
-    if (services_.fileManager.itemExistsAtURL(former))
+    if (needs_.fileManager.itemExistsAtURL(former))
         return true;
     // What cannot be examined counts as there: its move fails, no marker is written, and the next boot tries again. A
     // link on the way is the doing of the user who owned the place, and would keep failing.
     struct stat status{};
-    const int failure = services_.fileManager.resolver().status(former, status);
+    const int failure = needs_.fileManager.resolver().status(former, status);
     return failure != ENOENT && failure != ELOOP && failure != ENOTDIR;
 }
 
 Result<void> ZORContainerMigrator::moveFormerBundles(const FileURL& former, const FileURL& bundles) {
-    const auto present = TRY(services_.fileManager.urlsForItemsInDirectoryAtURL(bundles));
+    const auto present = TRY(needs_.fileManager.urlsForItemsInDirectoryAtURL(bundles));
     // Something lies there already: an earlier migration was cut short, or containers were made before this one. Or
     // what would come along is not all of the old owner's.
     if (!present.empty() || holdsOfOthers(former))
         return moveEachFormerBundle(former);
-    return services_.fileManager.moveItemAtURL(former, bundles, services_.setup.check());
+    return needs_.fileManager.moveItemAtURL(former, bundles, needs_.report.check());
 }
 
 bool ZORContainerMigrator::isOfAnother(const FileURL& directory) {
-    const auto judged = services_.fileManager.openDirectoryOf(services_.configuration.users().first, directory);
+    const auto judged = needs_.fileManager.openDirectoryOf(needs_.configuration.users().first, directory);
     return !judged && judged.error().isPosix(EPERM);
 }
 
 bool ZORContainerMigrator::holdsOfOthers(const FileURL& former) {
-    const auto items = services_.fileManager.urlsForItemsInDirectoryAtURL(former);
+    const auto items = needs_.fileManager.urlsForItemsInDirectoryAtURL(former);
     if (items && std::ranges::any_of(*items, [this](const FileURL& item) { return isOfAnother(item); }))
         return true;
     return std::ranges::any_of(bundleClasses, [this](ContainerClass containerClass) {
-        const auto containers = services_.fileManager.urlsForItemsInDirectoryAtURL(
-            services_.configuration.formerBundleDirectory(containerClass));
+        const auto containers =
+            needs_.fileManager.urlsForItemsInDirectoryAtURL(needs_.configuration.formerBundleDirectory(containerClass));
         return containers &&
                std::ranges::any_of(*containers, [this](const FileURL& container) { return isOfAnother(container); });
     });
@@ -189,10 +149,10 @@ bool ZORContainerMigrator::holdsOfOthers(const FileURL& former) {
 Result<void> ZORContainerMigrator::moveEachFormerBundle(const FileURL& former) {
     std::optional<ZORError> failure;
     for (const ContainerClass containerClass : bundleClasses) {
-        const FileURL source = services_.configuration.formerBundleDirectory(containerClass);
+        const FileURL source = needs_.configuration.formerBundleDirectory(containerClass);
         if (isOfAnother(source))
             continue;
-        const auto containers = services_.fileManager.urlsForItemsInDirectoryAtURL(source);
+        const auto containers = needs_.fileManager.urlsForItemsInDirectoryAtURL(source);
         // What the user put in a directory's place holds no containers; it goes with what is left.
         if (!containers && (containers.error().isPosix(ENOENT) || isMisshapen(containers.error())))
             continue;
@@ -200,10 +160,10 @@ Result<void> ZORContainerMigrator::moveEachFormerBundle(const FileURL& former) {
             failure = containers.error();
             continue;
         }
-        const auto target = services_.configuration.containerDirectoryURLForUser(
-            services_.configuration.users().installer, containerClass, false);
+        const auto target = needs_.configuration.containerDirectoryURLForUser(needs_.configuration.users().installer,
+                                                                              containerClass, false);
         for (const FileURL& container : *containers)
-            if (!services_.setup.goOn())
+            if (!needs_.report.goOn())
                 return posixError({migrationFunction, __LINE__}, ECANCELED, "The daemon was told to end");
             else if (isOfAnother(container))
                 continue;
@@ -215,53 +175,53 @@ Result<void> ZORContainerMigrator::moveEachFormerBundle(const FileURL& former) {
     if (failure)
         return *failure;
     if (holdsOfOthers(former)) {
-        services_.log.write(logLevelError, migrationFunction,
-                            "%s stays: something in it belongs to others than user %u; move that away, and remove it",
-                            former.c_str(), services_.configuration.users().first);
+        needs_.log.write(logLevelError, migrationFunction,
+                         "%s stays: something in it belongs to others than user %u; move that away, and remove it",
+                         former.c_str(), needs_.configuration.users().first);
         return {};
     }
     // What is left are directories that held containers, and what never was one. It is in nobody's way.
-    return services_.sharedClientConnection->_moveItemAtURLToDeathRow(former, StartDeletionThread::no);
+    return needs_.deathRow._moveItemAtURLToDeathRow(former, StartDeletionThread::no);
 }
 
 Result<void> ZORContainerMigrator::moveFormerBundle(const FileURL& container, const FileURL& target) {
     // One that lies in both places was copied from another file system, and the stop came before its source went.
-    if (services_.fileManager.itemExistsAtURL(target))
-        return services_.sharedClientConnection->_moveItemAtURLToDeathRow(container, StartDeletionThread::no);
-    ZORFileManager& fileManager = services_.fileManager;
+    if (needs_.fileManager.itemExistsAtURL(target))
+        return needs_.deathRow._moveItemAtURLToDeathRow(container, StartDeletionThread::no);
+    ZORFileManager& fileManager = needs_.fileManager;
     const FileURL place = target.deletingLastPathComponent();
     const auto from = fileManager.resolver().openParent(container);
     if (!from)
         return posixError({migrationFunction, __LINE__}, from.error(), "rename of %s to %s failed: %s",
                           container.c_str(), target.c_str(), errorText(from.error()));
     // The old owner's until the end of a migration that was cut short.
-    auto to = fileManager.openDirectoryOf(services_.configuration.users().first, place);
+    auto to = fileManager.openDirectoryOf(needs_.configuration.users().first, place);
     if (!to)
-        to = fileManager.openDirectoryOf(services_.configuration.users().installer, place);
+        to = fileManager.openDirectoryOf(needs_.configuration.users().installer, place);
     if (!to)
         return std::move(to).error();
-    TRY(fileManager.moveItem(from->directory.get(), container, to->get(), target, services_.setup.check()));
+    TRY(fileManager.moveItem(from->directory.get(), container, to->get(), target, needs_.report.check()));
     return {};
 }
 
 void ZORContainerMigrator::adoptBundlesOfClass(ContainerClass containerClass, Count& count) {
     const FileURL directory =
-        services_.configuration.sharedContainersDirectory().appendingDirectory(className(containerClass));
-    const auto containers = services_.fileManager.urlsForItemsInDirectoryAtURL(directory);
+        needs_.configuration.sharedContainersDirectory().appendingDirectory(className(containerClass));
+    const auto containers = needs_.fileManager.urlsForItemsInDirectoryAtURL(directory);
     if (!containers) {
         if (!containers.error().isPosix(ENOENT)) {
-            services_.log.write(logLevelError, migrationFunction, "Failed to get items at staging URL%s : %s",
-                                directory.c_str(), containers.error().text().c_str());
+            needs_.log.write(logLevelError, migrationFunction, "Failed to get items at staging URL%s : %s",
+                             directory.c_str(), containers.error().text().c_str());
             count.unfinished += isMisshapen(containers.error()) ? 0 : 1;
         }
         // The user who owned the old place may have put anything there; a link in a class directory's place would keep
         // the class from ever having one.
         if (isMisshapen(containers.error()))
-            (void)services_.sharedClientConnection->_moveItemAtURLToDeathRow(directory, StartDeletionThread::no);
+            (void)needs_.deathRow._moveItemAtURLToDeathRow(directory, StartDeletionThread::no);
         return;
     }
     for (const FileURL& container : *containers) {
-        if (!services_.setup.goOn()) {
+        if (!needs_.report.goOn()) {
             ++count.unfinished;
             return;
         }
@@ -276,38 +236,30 @@ void ZORContainerMigrator::adoptBundlesOfClass(ContainerClass containerClass, Co
 }
 
 Result<void> ZORContainerMigrator::adoptBundle(const FileURL& container) {
-    const Log& log = services_.log;
+    const Log& log = needs_.log;
     // Its owner was the mobile user, and so, perhaps, was its metadata file's.
     const auto read =
-        readAndValidateMetadataAtUrl(log, services_.fileManager, container, services_.configuration.users().first,
-                                     CheckClassPath::yes, services_.configuration.users().first);
+        readAndValidateMetadataAtUrl(log, needs_.fileManager, container, needs_.configuration.users().first,
+                                     CheckClassPath::yes, needs_.configuration.users().first);
     if (!read) {
         log.write(logLevelError, migrationFunction, "Failed to read metadata at URL %s : %s", container.c_str(),
                   read.error().text().c_str());
         return read.error();
     }
     const auto& record = *read;
-    record->setUid(services_.configuration.users().installer);
-    const auto written = record->writeMetadataToDiskWithError(log, services_.fileManager);
+    record->setUid(needs_.configuration.users().installer);
+    const auto written = record->writeMetadataToDiskWithError(log, needs_.fileManager);
     if (!written)
         return makeError(log, {migrationFunction, __LINE__}, ErrorCode::propertyListNotWritten, &written.error(),
                          LogFlag::yes, "Failed to write metadata for %u : %s, url: %s",
-                         services_.configuration.users().installer, ZOR_SHOWN(record->identifier()), container.c_str());
+                         needs_.configuration.users().installer, ZOR_SHOWN(record->identifier()), container.c_str());
     const auto added =
-        services_.cache.addContainerMetadata(record, services_.configuration.users().installer, record->place(), false);
+        needs_.cache.addContainerMetadata(record, needs_.configuration.users().installer, record->place(), false);
     if (!added)
         return makeError(log, {migrationFunction, __LINE__}, ErrorCode::cacheAddFailed, &added.error(), LogFlag::yes,
-                         "Failed to add to cache for %u : %s, url: %s", services_.configuration.users().installer,
+                         "Failed to add to cache for %u : %s, url: %s", needs_.configuration.users().installer,
                          ZOR_SHOWN(record->identifier()), container.c_str());
     return {};
-}
-
-int ZORContainerMigrator::orderBeforeMarker(const FileURL& bundles) {
-    const auto changed = services_.fileManager.resolver().openDirectory(bundles);
-    const auto next = services_.fileManager.resolver().openDirectory(services_.configuration.libraryDirectory());
-    if (!changed || !next)
-        return -(changed ? next.error() : changed.error());
-    return services_.durability.between(changed->get(), next->get());
 }
 
 // Well-known containers.
@@ -321,26 +273,25 @@ ZORContainerMigrator::Outcome ZORContainerMigrator::performWhitelistMigrationWit
 }
 
 bool ZORContainerMigrator::migrateWellknownOfClass(ContainerClass containerClass, Outcome& outcome) {
-    if (!services_.whitelist.isWhole(containerClass)) {
-        services_.log.write(logLevelError, whitelistFunction,
-                            "Not migrating to well-known names in %s: their table could not be read",
-                            className(containerClass));
+    if (!needs_.whitelist.isWhole(containerClass)) {
+        needs_.log.write(logLevelError, whitelistFunction,
+                         "Not migrating to well-known names in %s: their table could not be read",
+                         className(containerClass));
         return true;
     }
-    const auto classDirectory = services_.configuration.containerDirectoryURLForUser(
-        services_.configuration.users().system, containerClass, false);
-    const auto records =
-        services_.cache.allContainersForUser(services_.configuration.users().system, containerClass, false);
+    const auto classDirectory =
+        needs_.configuration.containerDirectoryURLForUser(needs_.configuration.users().system, containerClass, false);
+    const auto records = needs_.cache.allContainersForUser(needs_.configuration.users().system, containerClass, false);
     if (!records) {
-        services_.log.write(logLevelError, whitelistFunction,
-                            "Failed to get list of system containers for migration: (error= %s : %lld)",
-                            records.error().domainName(), code(records.error()));
+        needs_.log.write(logLevelError, whitelistFunction,
+                         "Failed to get list of system containers for migration: (error= %s : %lld)",
+                         records.error().domainName(), code(records.error()));
         outcome.succeeded = false;
         outcome.error = records.error();
         return false;
     }
     for (const auto& record : *records) {
-        if (!services_.setup.goOn())
+        if (!needs_.report.goOn())
             return false;
         auto migrated = migrateWellknown(record, containerClass, *classDirectory);
         if (!migrated) {
@@ -355,19 +306,18 @@ bool ZORContainerMigrator::migrateWellknownOfClass(ContainerClass containerClass
 
 Result<bool> ZORContainerMigrator::migrateWellknown(const std::shared_ptr<ZORMetadata>& record,
                                                     ContainerClass containerClass, const FileURL& classDirectory) {
-    const Log& log = services_.log;
+    const Log& log = needs_.log;
     const std::string& identifier = record->identifier();
-    if (identifier.empty() || !record->hasUrl() ||
-        !services_.whitelist.containerIdIsWellknown(identifier, containerClass))
+    if (identifier.empty() || !record->hasUrl() || !needs_.whitelist.containerIdIsWellknown(identifier, containerClass))
         return false;
     const FileURL target =
-        classDirectory.appendingDirectory(*services_.whitelist.wellknownContainerForId(identifier, containerClass));
+        classDirectory.appendingDirectory(*needs_.whitelist.wellknownContainerForId(identifier, containerClass));
     const FileURL former = record->url();
     if (former == target)
         return false;
     log.write(logLevelError, whitelistFunction, "Migrating well-known container %s", ZOR_SHOWN(identifier));
-    auto removed = services_.cache.removeContainerForUser(services_.configuration.users().system, containerClass,
-                                                          &identifier, false);
+    auto removed =
+        needs_.cache.removeContainerForUser(needs_.configuration.users().system, containerClass, &identifier, false);
     if (!removed) {
         log.write(logLevelError, whitelistFunction,
                   "%s: Failed to remove cache for whitelisted container %s: (error= %s: %lld)", whitelistOperation,
@@ -375,8 +325,8 @@ Result<bool> ZORContainerMigrator::migrateWellknown(const std::shared_ptr<ZORMet
         return std::move(removed).error();
     }
     auto moved = [&]() -> Result<void> {
-        const auto directory = TRY(services_.fileManager.openDirectoryOf(ownerUnchanged, classDirectory));
-        TRY(services_.fileManager.moveItem(directory.get(), former, directory.get(), target));
+        const auto directory = TRY(needs_.fileManager.openDirectoryOf(ownerUnchanged, classDirectory));
+        TRY(needs_.fileManager.moveItem(directory.get(), former, directory.get(), target));
         return {};
     }();
     if (!moved) {
@@ -386,8 +336,8 @@ Result<bool> ZORContainerMigrator::migrateWellknown(const std::shared_ptr<ZORMet
                   code(moved.error()));
         return std::move(moved).error();
     }
-    auto added = services_.cache.addContainerMetadata(record, services_.configuration.users().system,
-                                                      ContainerPlace(target), false);
+    auto added =
+        needs_.cache.addContainerMetadata(record, needs_.configuration.users().system, ContainerPlace(target), false);
     if (!added) {
         log.write(logLevelError, whitelistFunction,
                   "%s: Failed to update cache for whitelisted container %s: (error= %s: %lld)", whitelistOperation,

@@ -12,32 +12,36 @@
 #include "base/ContainerClass.h"
 #include "base/FileURL.h"
 #include "base/Result.h"
-#include "platform/Device.h"
+#include "operations/DeathRow.h"
+#include "operations/LastingMoves.h"
+#include "store/MigrationMarkers.h"
+#include "store/SetupReport.h"
+#include "store/ZORContainerCache.h"
+#include "store/ZORGlobalConfiguration.h"
+#include "store/ZORWhitelist.h"
 
 #include <cstdint>
 #include <memory>
 #include <optional>
-#include <string>
-#include <string_view>
 
 namespace zor {
 
-class ZORMetadata;
-struct StoreServices;
-
 class ZORContainerMigrator {
 public:
-    ZORContainerMigrator(StoreServices& services, const platform::SystemVersionQuery& systemVersion)
-        : services_(services), systemVersion_(systemVersion) {}
+    struct Needs {
+        const Log& log;
+        ZORFileManager& fileManager;
+        ZORGlobalConfiguration& configuration;
+        ZORContainerCache& cache;
+        const ZORWhitelist& whitelist;
+        MigrationMarkers& markers;
+        const LastingMoves& moves;
+        DeathRow& deathRow;
+        SetupReport& report;
+    };
+    explicit ZORContainerMigrator(const Needs& needs) : needs_(needs) {}
     ZORContainerMigrator(const ZORContainerMigrator&) = delete;
     ZORContainerMigrator& operator=(const ZORContainerMigrator&) = delete;
-
-    // Markers: a file that says that something need not be done again, and to people when it was.
-    void writeMigrationFileToDiskWithName(std::string_view name, const FileURL& directory);
-    void writeMigrationFileToDiskWithName(std::string_view name);
-    [[nodiscard]] bool existsMigrationFileWithName(std::string_view name);
-    /// Whether the marker is known not to be there: one that cannot be examined makes nothing happen a second time.
-    [[nodiscard]] bool isDue(std::string_view name);
 
     struct Outcome {
         bool succeeded = true;
@@ -70,15 +74,12 @@ private:
     };
     void adoptBundlesOfClass(ContainerClass containerClass, Count& count);
     Result<void> adoptBundle(const FileURL& container);
-    /// What was moved and given away is on the disk before the marker can be.
-    int orderBeforeMarker(const FileURL& bundles);
 
     bool migrateWellknownOfClass(ContainerClass containerClass, Outcome& outcome);
     Result<bool> migrateWellknown(const std::shared_ptr<ZORMetadata>& record, ContainerClass containerClass,
                                   const FileURL& classDirectory);
 
-    StoreServices& services_;
-    const platform::SystemVersionQuery& systemVersion_;
+    const Needs needs_;
 };
 
 } // namespace zor

@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "operations/ZORDataProtectionChangeOperation.h"
 
+#include "base/Assert.h"
 #include "base/BlockingScope.h"
-#include "operations/StoreServices.h"
 
 #include <cerrno>
 #include <chrono>
@@ -48,11 +48,11 @@ std::optional<DirectoryIdentity> identityOf(int directory) {
 } // namespace
 
 void ZORDataProtectionChangeOperation::performChangeOperation() {
-    conclude(services_.boundary.run({performFunction, __LINE__}, [&] { return attempt(); }));
+    conclude(needs_.boundary.run({performFunction, __LINE__}, [&] { return attempt(); }));
 }
 
 void ZORDataProtectionChangeOperation::retry() {
-    conclude(services_.boundary.run({performFunction, __LINE__}, [&] {
+    conclude(needs_.boundary.run({performFunction, __LINE__}, [&] {
         startRetry();
         return attempt();
     }));
@@ -81,15 +81,15 @@ void ZORDataProtectionChangeOperation::conclude(const Result<NeedRetry>& attempt
     std::optional<ZORError> error;
     if (!attempted) {
         error = attempted.error();
-        services_.log.write(logLevelNotice, performFunction,
-                            "Operation to update protection classes for user: %u, id: %s, containerClass: %llu to "
-                            "class %d failed with error %s",
-                            container.uid(), ZOR_SHOWN(container.identifier()), number(container.containerClass()),
-                            newDataProtectionClass_, error->text().c_str());
+        needs_.log.write(logLevelNotice, performFunction,
+                         "Operation to update protection classes for user: %u, id: %s, containerClass: %llu to "
+                         "class %d failed with error %s",
+                         container.uid(), ZOR_SHOWN(container.identifier()), number(container.containerClass()),
+                         newDataProtectionClass_, error->text().c_str());
     }
     if (locked)
         error =
-            makeError(services_.log, {performFunction, __LINE__}, ErrorCode::lockedAndNotRetried, nullptr, LogFlag::yes,
+            makeError(needs_.log, {performFunction, __LINE__}, ErrorCode::lockedAndNotRetried, nullptr, LogFlag::yes,
                       "Tried to update user: %u, id: %s, containerClass: %llu to protection class %d, but was "
                       "locked and didn't retry",
                       container.uid(), ZOR_SHOWN(container.identifier()), number(container.containerClass()),
@@ -100,21 +100,20 @@ void ZORDataProtectionChangeOperation::conclude(const Result<NeedRetry>& attempt
 
 void ZORDataProtectionChangeOperation::queueRetry() {
     const ZORMetadata& container = *dataContainerMetadata_;
-    services_.log.write(
+    needs_.log.write(
         logLevelNotice, performFunction,
         "Retrying container protection update to %d on next unlock for user: %u, id: %s, containerClass: %llu",
         newDataProtectionClass_, container.uid(), ZOR_SHOWN(container.identifier()),
         number(container.containerClass()));
-    ZORDispatchAsyncWithTransaction(services_.transactions, services_.lockStateQueue,
-                                    [self = shared_from_this()] { self->retry(); });
+    ZORDispatchAsyncWithTransaction(needs_.retries, [self = shared_from_this()] { self->retry(); });
 }
 
 Result<ZORDataProtectionChangeOperation::NeedRetry> ZORDataProtectionChangeOperation::_runChangeOperationNeedToRetry() {
     std::vector<Item> items;
     platform::FileDescriptor container;
     {
-        const IdentifierLock lock(services_.locks, dataContainerMetadata_->uuid().string(), LockMode::reading);
-        TRY(checkStillThere());
+        const IdentifierLock lock(needs_.locks, dataContainerMetadata_->uuid().string(), LockMode::reading);
+        TRY(checkStillThere(lock));
         items = existingItems();
         container = TRY(openContainer(items));
     }
@@ -123,35 +122,36 @@ Result<ZORDataProtectionChangeOperation::NeedRetry> ZORDataProtectionChangeOpera
         return NeedRetry::yes;
     TRY(walked);
     // Nothing may come between the look and the record: else what is recorded could be of a container that has gone.
-    const IdentifierLock lock(services_.locks, dataContainerMetadata_->uuid().string(), LockMode::writing);
-    TRY(checkStillThere());
-    const auto now = services_.fileManager.resolver().openDirectoryPath(dataContainerMetadata_->url());
+    const IdentifierWriteLock lock(needs_.locks, dataContainerMetadata_->uuid().string());
+    TRY(checkStillThere(lock));
+    const auto now = needs_.fileManager.resolver().openDirectoryPath(dataContainerMetadata_->url());
     const auto identity = now ? identityOf(now->get()) : std::nullopt;
     if (!identity || identity != identityOf(container.get()))
         return changedMeanwhile();
     if (recordBlock_)
-        recordBlock_();
+        recordBlock_(lock);
     return NeedRetry::no;
 }
 
 ZORError ZORDataProtectionChangeOperation::changedMeanwhile() {
-    return makeError(services_.log, {passFunction, __LINE__}, ErrorCode::pathNotAsExpected, nullptr, LogFlag::yes,
+    return makeError(needs_.log, {passFunction, __LINE__}, ErrorCode::pathNotAsExpected, nullptr, LogFlag::yes,
                      "Cancelling data protection operation because container path changed on disk. This indicates "
                      "the app may have been updated and changed its protection level.");
 }
 
-Result<void> ZORDataProtectionChangeOperation::checkStillThere() {
+Result<void> ZORDataProtectionChangeOperation::checkStillThere(const IdentifierLock& held) {
+    ZOR_ASSERT(held.identifier() == dataContainerMetadata_->uuid().string());
     const ZORMetadata& container = *dataContainerMetadata_;
     // Whatever else the identifier leads to, its record may be in another's hands: it is looked for, and not looked at.
     const auto found =
-        services_.cache.containerForUser(container.uid(), container.containerClass(), &container.identifier(), false);
+        needs_.cache.containerForUser(container.uid(), container.containerClass(), &container.identifier(), false);
     if (!found)
-        return makeError(services_.log, {passFunction, __LINE__}, ErrorCode::notFound, &found.error(), LogFlag::yes,
+        return makeError(needs_.log, {passFunction, __LINE__}, ErrorCode::notFound, &found.error(), LogFlag::yes,
                          "Failed to lookup container to set data protection for userId: %u, identifier: %s, Class: "
                          "%llu",
                          container.uid(), ZOR_SHOWN(container.identifier()), number(container.containerClass()));
-    const auto same = services_.cache.containerForUser(container.uid(), container.containerClass(),
-                                                       &container.identifier(), container.uuid().string());
+    const auto same = needs_.cache.containerForUser(container.uid(), container.containerClass(),
+                                                    &container.identifier(), container.uuid().string());
     if (!same || !*same || (*same)->transient() || (*same)->url() != container.url())
         return changedMeanwhile();
     return {};
@@ -161,7 +161,7 @@ std::vector<ZORDataProtectionChangeOperation::Item> ZORDataProtectionChangeOpera
     std::vector<Item> items;
     for (const std::string_view name : ZORGlobalConfiguration::appUserDataItemNames()) {
         const FileURL url = dataContainerMetadata_->url().appendingDirectory(name);
-        if (services_.fileManager.itemExistsAtURL(url))
+        if (needs_.fileManager.itemExistsAtURL(url))
             items.push_back({.name = std::string(name), .path = url.path()});
     }
     return items;
@@ -176,7 +176,7 @@ std::string ZORDataProtectionChangeOperation::shown(const std::vector<Item>& ite
 }
 
 Result<platform::FileDescriptor> ZORDataProtectionChangeOperation::openContainer(const std::vector<Item>& items) {
-    auto opened = services_.fileManager.resolver().openDirectory(dataContainerMetadata_->url());
+    auto opened = needs_.fileManager.resolver().openDirectory(dataContainerMetadata_->url());
     struct stat status{};
     if (!opened || ::fstat(opened->get(), &status) != 0) {
         const int number = platform::neverLocked(opened ? errno : opened.error());
@@ -209,8 +209,8 @@ Result<void> ZORDataProtectionChangeOperation::walk(int container, const std::ve
         if (failure)
             return *failure;
         if (status < 0)
-            services_.log.write(logLevelError, passFunction, "FTS returned error for %s : %s", item.path.c_str(),
-                                errorText(-status));
+            needs_.log.write(logLevelError, passFunction, "FTS returned error for %s : %s", item.path.c_str(),
+                             errorText(-status));
     }
     saySharedFiles();
     return {};
@@ -219,10 +219,10 @@ Result<void> ZORDataProtectionChangeOperation::walk(int container, const std::ve
 void ZORDataProtectionChangeOperation::saySharedFiles() const {
     const std::uint64_t left = namesMet_.unfinished() + foreignFiles_;
     if (left > 0)
-        services_.log.write(logLevelNotice, passFunction,
-                            "Left the protection class of %llu files in %s as it is: they have names outside, or "
-                            "another owner",
-                            static_cast<unsigned long long>(left), dataContainerMetadata_->url().c_str());
+        needs_.log.write(logLevelNotice, passFunction,
+                         "Left the protection class of %llu files in %s as it is: they have names outside, or "
+                         "another owner",
+                         static_cast<unsigned long long>(left), dataContainerMetadata_->url().c_str());
 }
 
 Result<void> ZORDataProtectionChangeOperation::visit(const WalkEntry& entry, const Item& item) {
@@ -242,8 +242,8 @@ Result<void> ZORDataProtectionChangeOperation::visit(const WalkEntry& entry, con
     case WalkEntryKind::noStatus:
         break;
     }
-    services_.log.write(logLevelError, passFunction, "FTS returned error for %s : %s", ZOR_SHOWN(path()),
-                        errorText(entry.error));
+    needs_.log.write(logLevelError, passFunction, "FTS returned error for %s : %s", ZOR_SHOWN(path()),
+                     errorText(entry.error));
     return {};
 }
 
@@ -265,21 +265,20 @@ Result<void> ZORDataProtectionChangeOperation::changeFile(const WalkEntry& entry
 Result<void> ZORDataProtectionChangeOperation::setClass(const WalkEntry& entry, const std::string& path,
                                                         std::int32_t target, const Declines& declines) {
     mode_t mode = 0;
-    auto set = services_.fileManager.setDataProtectionClassOfEntry(
+    auto set = needs_.fileManager.setDataProtectionClassOfEntry(
         entry, path, target, [&](const struct stat& status, int current) {
             mode = status.st_mode;
             if (declines(status, current))
                 return false;
-            if (services_.log.writes(logLevelDebug))
-                services_.log.write(logLevelDebug, passFunction, "Setting protection class of %s to %d",
-                                    ZOR_SHOWN(path), target);
+            if (needs_.log.writes(logLevelDebug))
+                needs_.log.write(logLevelDebug, passFunction, "Setting protection class of %s to %d", ZOR_SHOWN(path),
+                                 target);
             return true;
         });
     if (set || !set.error().isPosix(EBADF))
         return set;
-    services_.log.write(logLevelError, passFunction,
-                        "Ignoring failure to set protection class to %d on %s (mode 0%o): %s", target, ZOR_SHOWN(path),
-                        mode, set.error().text().c_str());
+    needs_.log.write(logLevelError, passFunction, "Ignoring failure to set protection class to %d on %s (mode 0%o): %s",
+                     target, ZOR_SHOWN(path), mode, set.error().text().c_str());
     return {};
 }
 

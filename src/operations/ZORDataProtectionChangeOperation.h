@@ -15,8 +15,14 @@
 // Held by shared_ptr: a retry that waits on the lock-state queue keeps it. It runs on one thread at a time.
 #pragma once
 
+#include "base/Result.h"
+#include "base/ZORException.h"
+#include "base/ZORLocks.h"
 #include "fs/TreeWalker.h"
-#include "operations/ZORClientConnection.h"
+#include "fs/ZORFileManager.h"
+#include "operations/Background.h"
+#include "store/ZORContainerCache.h"
+#include "store/ZORMetadata.h"
 
 #include <cstdint>
 #include <functional>
@@ -47,16 +53,25 @@ struct DirectoryIdentity {
 
 class ZORDataProtectionChangeOperation : public std::enable_shared_from_this<ZORDataProtectionChangeOperation> {
 public:
+    struct Needs {
+        const Log& log;
+        ExceptionBoundary& boundary;
+        ZORLocks& locks;
+        ZORFileManager& fileManager;
+        ZORContainerCache& cache;
+        /// The lock-state queue.
+        Background retries;
+    };
     enum class RetryIfLocked : bool { no, yes };
     /// `wasLocked`: a pass met a locked device, and no retry was wanted.
     using CompletionBlock = std::function<void(bool wasLocked, const std::optional<ZORError>& error)>;
 
     /// initWithContainerMetadata:newClass:retryingIfLocked:changeType:. The record is the operation's own: as the
     /// container was when the change was asked for.
-    ZORDataProtectionChangeOperation(StoreServices& services, std::shared_ptr<const ZORMetadata> dataContainerMetadata,
+    ZORDataProtectionChangeOperation(const Needs& needs, std::shared_ptr<const ZORMetadata> dataContainerMetadata,
                                      std::int32_t newDataProtectionClass, RetryIfLocked retryIfLocked,
                                      std::int32_t operationType)
-        : services_(services), dataContainerMetadata_(std::move(dataContainerMetadata)),
+        : needs_(needs), dataContainerMetadata_(std::move(dataContainerMetadata)),
           newDataProtectionClass_(newDataProtectionClass), retryIfLocked_(retryIfLocked),
           operationType_(operationType) {}
     ZORDataProtectionChangeOperation(const ZORDataProtectionChangeOperation&) = delete;
@@ -66,7 +81,7 @@ public:
     void setRetryStartBlock(std::function<void()> block) { retryStartBlock_ = std::move(block); }
     /// Runs once, when a pass has changed all there is, under the container's lock, held for writing. The container is
     /// the one that the change was asked for.
-    void setRecordBlock(std::function<void()> block) { recordBlock_ = std::move(block); }
+    void setRecordBlock(std::function<void(const IdentifierWriteLock&)> block) { recordBlock_ = std::move(block); }
     /// Runs once, when the operation ends.
     void setCompletionBlock(CompletionBlock block) { completionBlock_ = std::move(block); }
 
@@ -84,8 +99,8 @@ private:
     /// Calls the completion, unless a retry is queued.
     void conclude(const Result<NeedRetry>& attempted);
 
-    /// Errors 21, 10. The caller holds the container's lock.
-    Result<void> checkStillThere();
+    /// Errors 21, 10.
+    Result<void> checkStillThere(const IdentifierLock& held);
     ZORError changedMeanwhile();
     struct Item {
         std::string name;
@@ -105,14 +120,14 @@ private:
     [[nodiscard]] bool isShared(const struct stat& status);
     void saySharedFiles() const;
 
-    StoreServices& services_;
+    const Needs needs_;
     const std::shared_ptr<const ZORMetadata> dataContainerMetadata_;
     const std::int32_t newDataProtectionClass_;
     const RetryIfLocked retryIfLocked_;
     const std::int32_t operationType_;
     bool retried_ = false;
     std::function<void()> retryStartBlock_;
-    std::function<void()> recordBlock_;
+    std::function<void(const IdentifierWriteLock&)> recordBlock_;
     CompletionBlock completionBlock_;
     std::optional<DirectoryIdentity> firstMet_;
     // Of one pass.

@@ -2,9 +2,7 @@
 #include "operations/ZORDataProtectionManager.h"
 
 #include "ipc/Keys.h"
-#include "operations/StoreServices.h"
 #include "operations/ZORApplicationTerminationAssertion.h"
-#include "operations/ZORDataProtectionChangeOperation.h"
 
 namespace zor {
 
@@ -69,9 +67,10 @@ struct ZORDataProtectionManager::Change {
 
 void ZORDataProtectionManager::setDataProtectionOnDataContainerForUser(const Request& request,
                                                                        const Completion& completion) {
-    auto prepared = services_.boundary.run(
-        {function, __LINE__},
-        [&]() -> Result<std::shared_ptr<ZORDataProtectionChangeOperation>> { return prepare(request, completion); });
+    auto prepared =
+        needs_.boundary.run({function, __LINE__}, [&]() -> Result<std::shared_ptr<ZORDataProtectionChangeOperation>> {
+            return prepare(request, completion);
+        });
     if (!prepared)
         completion(prepared.error().replyCode());
     else if (!*prepared)
@@ -93,7 +92,7 @@ ZORDataProtectionManager::prepare(const Request& request, const Completion& comp
         return std::shared_ptr<Operation>();
     TRY(checkClass(request));
     TRY(checkBound(request));
-    auto operation = std::make_shared<Operation>(services_, container, request.dataProtectionClass,
+    auto operation = std::make_shared<Operation>(needs_.change, container, request.dataProtectionClass,
                                                  request.retryIfLocked ? Operation::RetryIfLocked::yes
                                                                        : Operation::RetryIfLocked::no,
                                                  changeType(current, request.dataProtectionClass));
@@ -101,10 +100,10 @@ ZORDataProtectionManager::prepare(const Request& request, const Completion& comp
     operation->setRetryStartBlock([this, change] {
         change->dropAssertion();
         change->assertion = ZORApplicationTerminationAssertion::initWithBundleIdentifier(
-            services_.log, services_.assertions, change->container->identifier(),
+            needs_.log, needs_.assertions, change->container->identifier(),
             static_cast<std::uint8_t>(platform::TerminationReason::installation));
     });
-    operation->setRecordBlock([this, change] { record(*change); });
+    operation->setRecordBlock([this, change](const IdentifierWriteLock& held) { record(*change, held); });
     operation->setCompletionBlock(
         [this, change](bool wasLocked, const std::optional<ZORError>& error) { finish(*change, wasLocked, error); });
     return operation;
@@ -112,15 +111,15 @@ ZORDataProtectionManager::prepare(const Request& request, const Completion& comp
 
 Result<std::shared_ptr<const ZORMetadata>> ZORDataProtectionManager::containerOf(const Request& request) {
     if (!request.identifier || !isPerUserClass(request.containerClass))
-        return makeError(services_.log, {function, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
+        return makeError(needs_.log, {function, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
                          "Can't act on an invalid object: userId: %u, ID: %s, class: %ld", request.userId,
                          ZOR_SHOWN(request.identifier), static_cast<long>(request.containerClass));
     // Records are shared: what this change goes by is copied while nobody can change it.
-    const AllIdentifiersLock lock(services_.locks, LockMode::reading);
+    const AllIdentifiersLock lock(needs_.locks, LockMode::reading);
     const auto record =
-        services_.cache.containerForUser(request.userId, request.containerClass, &*request.identifier, false);
+        needs_.cache.containerForUser(request.userId, request.containerClass, &*request.identifier, false);
     if (!record)
-        return makeError(services_.log, {function, __LINE__}, ErrorCode::notFound, &record.error(), LogFlag::yes,
+        return makeError(needs_.log, {function, __LINE__}, ErrorCode::notFound, &record.error(), LogFlag::yes,
                          "No Container with userId: %u, identifier: %s, Class: %ld", request.userId,
                          ZOR_SHOWN(request.identifier), static_cast<long>(request.containerClass));
     const ZORMetadata& found = **record;
@@ -131,10 +130,10 @@ Result<std::shared_ptr<const ZORMetadata>> ZORDataProtectionManager::containerOf
 Result<void> ZORDataProtectionManager::checkClass(const Request& request) {
     const int requested = request.dataProtectionClass;
     if (requested == classNeverAllowed)
-        return makeError(services_.log, {function, __LINE__}, ErrorCode::valueNotAllowed, nullptr, LogFlag::yes,
+        return makeError(needs_.log, {function, __LINE__}, ErrorCode::valueNotAllowed, nullptr, LogFlag::yes,
                          "Data protection class %d is not allowed", requested);
     if (request.isSecondOrThirdPartyApp && (requested < 0 || requested > classMaxOfOthers))
-        return makeError(services_.log, {function, __LINE__}, ErrorCode::valueNotAllowed, nullptr, LogFlag::yes,
+        return makeError(needs_.log, {function, __LINE__}, ErrorCode::valueNotAllowed, nullptr, LogFlag::yes,
                          "Data protection class %d is invalid for 2nd and 3rd party apps", requested);
     return {};
 }
@@ -144,41 +143,40 @@ Result<void> ZORDataProtectionManager::checkBound(const Request& request) {
         const MutexLock lock(mutex_);
         return pending_.size();
     }();
-    if (request.byOwner || changes < services_.limits.protectionChangesMax)
+    if (request.byOwner || changes < needs_.limits.protectionChangesMax)
         return {};
-    return makeError(services_.log, {function, __LINE__}, ErrorCode::lockedAndNotRetried, nullptr, LogFlag::yes,
+    return makeError(needs_.log, {function, __LINE__}, ErrorCode::lockedAndNotRetried, nullptr, LogFlag::yes,
                      "%llu changes of protection wait already, and no more may; ask again after an unlock",
                      static_cast<unsigned long long>(changes));
 }
 
 void ZORDataProtectionManager::finish(Change& change, bool wasLocked, const std::optional<ZORError>& error) {
     if (error)
-        services_.log.write(logLevelError, function,
-                            "Failed to set data protection on container with identifier %s at %s to %d: %s",
-                            ZOR_SHOWN(change.container->identifier()), change.container->url().c_str(),
-                            change.request.dataProtectionClass, error->text().c_str());
+        needs_.log.write(logLevelError, function,
+                         "Failed to set data protection on container with identifier %s at %s to %d: %s",
+                         ZOR_SHOWN(change.container->identifier()), change.container->url().c_str(),
+                         change.request.dataProtectionClass, error->text().c_str());
     if (wasLocked && change.request.retryIfLocked)
-        services_.log.write(logLevelError, function, "Unexpectedly got completion block called with wasLocked");
+        needs_.log.write(logLevelError, function, "Unexpectedly got completion block called with wasLocked");
     change.dropAssertion();
     change.end();
     change.completion(error ? error->replyCode() : ErrorCode::success);
 }
 
-void ZORDataProtectionManager::record(const Change& change) {
+void ZORDataProtectionManager::record(const Change& change, const IdentifierWriteLock& held) {
     const ZORMetadata& container = *change.container;
     const plist::Value value(change.request.dataProtectionClass);
     const std::string key(ipc::infoKeys::contentProtectionClass);
-    const auto recorded = services_.sharedClientConnection->setInfoValue(&value, &key,
-                                                                         {.userId = change.request.userId,
-                                                                          .uuid = container.uuid(),
-                                                                          .identifier = container.identifier(),
-                                                                          .containerClass = container.containerClass()},
-                                                                         UseLocking::no);
+    const auto recorded = needs_.infoValues.setInfoValue(Caller::daemonItself(), &value, &key,
+                                                         {.userId = change.request.userId,
+                                                          .uuid = container.uuid(),
+                                                          .identifier = container.identifier(),
+                                                          .containerClass = container.containerClass()},
+                                                         held);
     if (!recorded)
-        services_.log.write(logLevelError, function, "Failed to set protection class info for %s at %s to %d : %llu",
-                            ZOR_SHOWN(container.identifier()), container.url().c_str(),
-                            change.request.dataProtectionClass,
-                            static_cast<unsigned long long>(recorded.error().replyCode()));
+        needs_.log.write(logLevelError, function, "Failed to set protection class info for %s at %s to %d : %llu",
+                         ZOR_SHOWN(container.identifier()), container.url().c_str(), change.request.dataProtectionClass,
+                         static_cast<unsigned long long>(recorded.error().replyCode()));
 }
 
 } // namespace zor

@@ -11,6 +11,13 @@
 #include "base/Mutex.h"
 #include "base/Result.h"
 #include "base/UUID.h"
+#include "base/ZORException.h"
+#include "base/ZORLocks.h"
+#include "operations/InfoValues.h"
+#include "operations/ZORDataProtectionChangeOperation.h"
+#include "platform/Device.h"
+#include "store/StoreLimits.h"
+#include "store/ZORContainerCache.h"
 
 #include <cstdint>
 #include <functional>
@@ -22,12 +29,19 @@
 
 namespace zor {
 
-class ZORDataProtectionChangeOperation;
-class ZORMetadata;
-struct StoreServices;
-
 class ZORDataProtectionManager {
 public:
+    struct Needs {
+        const Log& log;
+        ExceptionBoundary& boundary;
+        ZORLocks& locks;
+        ZORContainerCache& cache;
+        platform::TerminationAssertionService& assertions;
+        const StoreLimits& limits;
+        InfoValues& infoValues;
+        /// What each change needs.
+        ZORDataProtectionChangeOperation::Needs change;
+    };
     struct Request {
         std::uint32_t userId = 0;
         std::optional<std::string> identifier;
@@ -40,7 +54,7 @@ public:
     };
     using Completion = std::function<void(ErrorCode)>;
 
-    explicit ZORDataProtectionManager(StoreServices& services) : services_(services) {}
+    explicit ZORDataProtectionManager(const Needs& needs) : needs_(needs) {}
     ZORDataProtectionManager(const ZORDataProtectionManager&) = delete;
     ZORDataProtectionManager& operator=(const ZORDataProtectionManager&) = delete;
 
@@ -57,6 +71,7 @@ public:
         std::int32_t dataProtectionClass = 0;
     };
     [[nodiscard]] std::vector<Pending> pending() ZOR_EXCLUDES(mutex_);
+    [[nodiscard]] const ZORDataProtectionChangeOperation::Needs& needsOfAChange() const { return needs_.change; }
 
 private:
     struct Change;
@@ -69,9 +84,9 @@ private:
     /// Error 61 when too many wait already.
     Result<void> checkBound(const Request& request) ZOR_EXCLUDES(mutex_);
     void finish(Change& change, bool wasLocked, const std::optional<ZORError>& error);
-    void record(const Change& change);
+    void record(const Change& change, const IdentifierWriteLock& held);
 
-    StoreServices& services_;
+    const Needs needs_;
     platform::Mutex mutex_;
     std::list<Pending> pending_ ZOR_GUARDED_BY(mutex_);
 };

@@ -2,9 +2,6 @@
 #include "operations/ZORGroupManager.h"
 
 #include "base/UserIdentity.h"
-#include "operations/StoreServices.h"
-#include "operations/ZORClientConnection.h"
-#include "operations/ZOREntitlementMapping.h"
 
 #include <algorithm>
 
@@ -16,102 +13,110 @@ ContainerClass classOf(GroupType type) {
     return type == GroupType::application ? ContainerClass::sharedAppGroup : ContainerClass::sharedSystemGroup;
 }
 
+ContainerToGo toGo(std::uint32_t userId, const ZORMetadata& record) {
+    return {.userId = userId,
+            .uuid = record.uuid(),
+            .identifier = record.identifier(),
+            .containerClass = record.containerClass()};
+}
+
 } // namespace
 
 void ZORGroupManager::forEachUser(GroupType type, const std::function<void(std::uint32_t)>& function) {
     if (type == GroupType::system) {
-        function(services_.configuration.users().system);
+        function(needs_.configuration.users().system);
         return;
     }
-    for (std::uint32_t userId = services_.configuration.users().first; userId <= services_.configuration.users().last;
+    for (std::uint32_t userId = needs_.configuration.users().first; userId <= needs_.configuration.users().last;
          ++userId) {
-        ZORPerUserConfiguration* user = services_.configuration.getPerUserConfigurationForUserId(userId);
+        ZORPerUserConfiguration* user = needs_.configuration.getPerUserConfigurationForUserId(userId);
         if (user && user->existsUserBaseDirectory())
             function(userId);
     }
 }
 
-std::optional<ZORGroupManager::References>
-ZORGroupManager::_copyReferenceCountSetOfType(GroupType type, const plist::Dictionary& map) const {
-    if (const auto lost = services_.entitlements.lostFile()) {
-        log_.write(logLevelError, __func__,
-                   "%s holds entitlements that could not be read; references cannot be counted", lost->c_str());
+std::optional<ZORGroupManager::References> ZORGroupManager::_copyReferenceCountSetOfType(GroupType type) {
+    if (const auto lost = needs_.entitlements.lostFile()) {
+        needs_.log.write(logLevelError, __func__,
+                         "%s holds entitlements that could not be read; references cannot be counted", lost->c_str());
         return std::nullopt;
     }
-    if (type == GroupType::application && !services_.entitlements.groupIdsAreMigrated()) {
-        log_.write(logLevelError, __func__,
-                   "Groups that data containers refer to have not been migrated; references cannot be counted");
+    if (type == GroupType::application && !needs_.entitlements.groupIdsAreMigrated()) {
+        needs_.log.write(logLevelError, __func__,
+                         "Groups that data containers refer to have not been migrated; references cannot be counted");
         return std::nullopt;
     }
-    return groupReferencesIn(map, type, &log_);
+    return needs_.entitlements.groupReferences(type);
 }
 
 void ZORGroupManager::handleChangeFromOldGroupContainerIds(Identifiers oldGroups, const Identifiers& newGroups,
                                                            GroupType type, const std::string& identifier,
-                                                           const plist::Dictionary& map) {
+                                                           const AllIdentifiersWriteLock& lock) {
     if (!oldGroups || oldGroups == newGroups)
         return;
     if (newGroups)
         std::erase_if(*oldGroups, [&](const std::string& group) {
             return std::ranges::find(*newGroups, group) != newGroups->end();
         });
-    _removeReferenceForGroupIdentifiers(*oldGroups, type, identifier, map);
+    _removeReferenceForGroupIdentifiers(*oldGroups, type, identifier, lock);
 }
 
 void ZORGroupManager::_removeReferenceForGroupIdentifiers(const std::vector<std::string>& groups, GroupType type,
-                                                          const std::string& identifier, const plist::Dictionary& map) {
+                                                          const std::string& identifier,
+                                                          const AllIdentifiersWriteLock& lock) {
     if (groups.empty())
         return;
-    const auto references = _copyReferenceCountSetOfType(type, map);
+    const auto references = _copyReferenceCountSetOfType(type);
     if (!references) {
-        log_.write(logLevelError, __func__, "Failed to get reference count information for group type: %ld",
-                   static_cast<long>(type));
+        needs_.log.write(logLevelError, __func__, "Failed to get reference count information for group type: %ld",
+                         static_cast<long>(type));
         return;
     }
     forEachUser(type, [&](std::uint32_t userId) {
         for (const std::string& group : groups)
-            _removeGroupContainersIfNeededforUser(userId, classOf(type), group, identifier, *references);
+            _removeGroupContainersIfNeededforUser(userId, classOf(type), group, identifier, *references, lock);
     });
 }
 
 void ZORGroupManager::_removeGroupContainersIfNeededforUser(std::uint32_t userId, ContainerClass containerClass,
                                                             const std::string& group, const std::string& identifier,
-                                                            const References& references) {
+                                                            const References& references,
+                                                            const AllIdentifiersWriteLock& lock) {
     const auto holders = references.find(group);
     const std::size_t count = holders == references.end() ? 0 : holders->second.size();
     // One reference that is somebody else's is not the one that goes.
     if (count != 1 || holders->second.front() != identifier) {
-        ZOR_LOG(log_, logLevelDebug, "Reference count for user: %u, ID: %s is %ld", userId, ZOR_SHOWN(group),
+        ZOR_LOG(needs_.log, logLevelDebug, "Reference count for user: %u, ID: %s is %ld", userId, ZOR_SHOWN(group),
                 static_cast<long>(count));
         return;
     }
-    const auto record = services_.cache.containerForUser(userId, containerClass, &group, false);
+    const auto record = needs_.cache.containerForUser(userId, containerClass, &group, false);
     if (!record) {
-        ZOR_LOG(log_, logLevelDebug, "Failed to retrieve group container %s for %u : %s.  May not exist for this user",
-                ZOR_SHOWN(group), userId, record.error().text().c_str());
+        ZOR_LOG(needs_.log, logLevelDebug,
+                "Failed to retrieve group container %s for %u : %s.  May not exist for this user", ZOR_SHOWN(group),
+                userId, record.error().text().c_str());
         return;
     }
-    log_.write(logLevelNotice, __func__, "Last reference to group container %s for %u is going away; removing it.",
-               ZOR_SHOWN(group), userId);
-    stageGroupContainer(__func__, userId, **record, UseLocking::no);
+    needs_.log.write(logLevelNotice, __func__,
+                     "Last reference to group container %s for %u is going away; removing it.", ZOR_SHOWN(group),
+                     userId);
+    (void)isStaged(__func__, userId, **record, needs_.removal.stage(toGo(userId, **record), lock));
 }
 
-bool ZORGroupManager::stageGroupContainer(const char* function, std::uint32_t userId, const ZORMetadata& record,
-                                          UseLocking useLocking) {
-    const auto staged = services_.sharedClientConnection->stageForDeleteContainersWithUsers(
-        ZORClientConnection::DeletionBatch::of(userId, record.uuid(), record.identifier(), record.containerClass()),
-        useLocking);
+bool ZORGroupManager::isStaged(const char* function, std::uint32_t userId, const ZORMetadata& record,
+                               const Result<void>& staged) {
     if (!staged)
-        log_.write(logLevelError, function, "Failed to destroy group container with identifier %s for %u: %llu",
-                   ZOR_SHOWN(record.identifier()), userId, static_cast<unsigned long long>(staged.error().replyCode()));
+        needs_.log.write(logLevelError, function, "Failed to destroy group container with identifier %s for %u: %llu",
+                         ZOR_SHOWN(record.identifier()), userId,
+                         static_cast<unsigned long long>(staged.error().replyCode()));
     return staged.has_value();
 }
 
 std::uint64_t ZORGroupManager::reconcileGroupContainersOfType(GroupType type) {
-    const auto references = _copyReferenceCountSetOfType(type, services_.entitlements.entitlementMappingDict());
+    const auto references = _copyReferenceCountSetOfType(type);
     if (!references) {
-        log_.write(logLevelError, __func__, "Failed to get reference count information for group type: %ld",
-                   static_cast<long>(type));
+        needs_.log.write(logLevelError, __func__, "Failed to get reference count information for group type: %ld",
+                         static_cast<long>(type));
         return 0;
     }
     std::uint64_t removed = 0;
@@ -124,50 +129,48 @@ std::uint64_t ZORGroupManager::reconcileGroupContainersOfType(GroupType type) {
 std::uint64_t ZORGroupManager::_cleanupUnreferencedGroupContainersForUser(std::uint32_t userId,
                                                                           ContainerClass containerClass,
                                                                           const References& references) {
-    const auto records = services_.cache.allContainersForUser(userId, containerClass, false);
+    const auto records = needs_.cache.allContainersForUser(userId, containerClass, false);
     if (!records) {
-        log_.write(logLevelError, __func__, "Failed to fetch group container list for %u: %s", userId,
-                   records.error().text().c_str());
+        needs_.log.write(logLevelError, __func__, "Failed to fetch group container list for %u: %s", userId,
+                         records.error().text().c_str());
         return 0;
     }
     std::uint64_t removed = 0;
     for (const auto& record : *records) {
-        if (!services_.setup.goOn())
+        if (!needs_.report.goOn())
             break;
         if (references.contains(record->identifier()))
             continue;
-        log_.write(logLevelError, __func__, "Removing group container with identifier %s for %u",
-                   ZOR_SHOWN(record->identifier()), userId);
-        removed += stageGroupContainer(__func__, userId, *record, UseLocking::yes) ? 1 : 0;
+        needs_.log.write(logLevelError, __func__, "Removing group container with identifier %s for %u",
+                         ZOR_SHOWN(record->identifier()), userId);
+        removed += isStaged(__func__, userId, *record, needs_.removal.stage(toGo(userId, *record))) ? 1 : 0;
     }
     return removed;
 }
 
-Result<ZORGroupManager::Paths> ZORGroupManager::groupContainerPathsForUser(std::uint32_t userId,
-                                                                           ZORClientConnection& clientConnection,
+Result<ZORGroupManager::Paths> ZORGroupManager::groupContainerPathsForUser(std::uint32_t userId, const Caller& caller,
                                                                            const std::string* identifier) {
     constexpr Here here{"groupContainerPathsForUser", __LINE__};
-    return services_.boundary.run(here, [&]() -> Result<Paths> {
+    return needs_.boundary.run(here, [&]() -> Result<Paths> {
         if (!identifier)
-            return makeError(log_, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
+            return makeError(needs_.log, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
                              "Can't act on an invalid object: userId: %u, ID: %s", userId, "(null)");
         const auto groupFailed = [&](const ZORError& error) {
-            log_.write(logLevelError, here.function,
-                       "Failed to create or lookup group container-userId: %u, ID: %s : %llu", userId,
-                       ZOR_SHOWN(*identifier), static_cast<unsigned long long>(error.replyCode()));
+            needs_.log.write(logLevelError, here.function,
+                             "Failed to create or lookup group container-userId: %u, ID: %s : %llu", userId,
+                             ZOR_SHOWN(*identifier), static_cast<unsigned long long>(error.replyCode()));
         };
         std::vector<FoundContainer> containers;
         {
-            const AllIdentifiersLock lock(services_.locks, LockMode::writing);
-            const bool system = userId == services_.configuration.users().system;
-            const auto groups = system ? services_.entitlements.systemGroupIdentifiersForIdentifier(*identifier)
-                                       : services_.entitlements.appGroupIdentifiersForIdentifier(*identifier);
+            const AllIdentifiersWriteLock lock(needs_.locks);
+            const bool system = userId == needs_.configuration.users().system;
+            const auto groups = system ? needs_.entitlements.systemGroupIdentifiersForIdentifier(*identifier)
+                                       : needs_.entitlements.appGroupIdentifiersForIdentifier(*identifier);
             // Whoever may ask at all may ask for any identifier's: a path opens nothing, its directory has an owner.
-            clientConnection.setAllowGroupIdLookup(true);
             for (const std::string& group : groups.value_or(std::vector<std::string>())) {
-                auto found = clientConnection.createOrLookupContainerForUser(
-                    userId, &group, system ? ContainerClass::sharedSystemGroup : ContainerClass::sharedAppGroup,
-                    {.createIfNecessary = true, .transient = false, .useLocking = UseLocking::no});
+                auto found = needs_.creation.createOrLookupContainerForUser(
+                    caller, userId, &group, system ? ContainerClass::sharedSystemGroup : ContainerClass::sharedAppGroup,
+                    {.createIfNecessary = true, .transient = false}, lock);
                 if (found)
                     containers.push_back(std::move(*found));
                 else
@@ -176,7 +179,7 @@ Result<ZORGroupManager::Paths> ZORGroupManager::groupContainerPathsForUser(std::
         }
         Paths paths;
         for (const FoundContainer& container : containers)
-            if (const auto synced = clientConnection.makeDurable(container))
+            if (const auto synced = needs_.creation.makeDurable(container))
                 paths.emplace(container.record->identifier(), container.path);
             else
                 groupFailed(synced.error());
@@ -187,13 +190,12 @@ Result<ZORGroupManager::Paths> ZORGroupManager::groupContainerPathsForUser(std::
 Result<std::vector<std::string>> ZORGroupManager::groupContainerIdentifiersForUser(std::uint32_t userId,
                                                                                    const std::string* identifier) {
     constexpr Here here{"groupContainerIdentifiersForUser", __LINE__};
-    return services_.boundary.run(here, [&]() -> Result<std::vector<std::string>> {
+    return needs_.boundary.run(here, [&]() -> Result<std::vector<std::string>> {
         if (!identifier)
-            return makeError(log_, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
+            return makeError(needs_.log, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
                              "Can't act on an invalid object: userId: %u, ID: %s", userId, "(null)");
-        const AllIdentifiersLock lock(services_.locks, LockMode::writing);
-        return services_.entitlements.appGroupIdentifiersForIdentifier(*identifier)
-            .value_or(std::vector<std::string>());
+        const AllIdentifiersWriteLock lock(needs_.locks);
+        return needs_.entitlements.appGroupIdentifiersForIdentifier(*identifier).value_or(std::vector<std::string>());
     });
 }
 

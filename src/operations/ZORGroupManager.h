@@ -8,70 +8,79 @@
 
 #include "base/ContainerClass.h"
 #include "base/Result.h"
-#include "plist/Value.h"
+#include "base/ZORException.h"
+#include "base/ZORLocks.h"
+#include "operations/Caller.h"
+#include "operations/ContainerRemoval.h"
+#include "operations/Creation.h"
 #include "store/EntitlementFile.h"
+#include "store/SetupReport.h"
+#include "store/ZORContainerCache.h"
+#include "store/ZOREntitlementMapping.h"
+#include "store/ZORGlobalConfiguration.h"
 
 #include <cstdint>
 #include <functional>
 #include <map>
 #include <optional>
 #include <string>
-#include <string_view>
 #include <vector>
 
 namespace zor {
 
-struct StoreServices;
-class ZORClientConnection;
-class ZORMetadata;
-enum class UseLocking : std::int32_t;
-
 class ZORGroupManager {
 public:
-    using Identifiers = std::optional<std::vector<std::string>>;
+    struct Needs {
+        const Log& log;
+        ExceptionBoundary& boundary;
+        ZORLocks& locks;
+        ZORGlobalConfiguration& configuration;
+        ZORContainerCache& cache;
+        ZOREntitlementMapping& entitlements;
+        Creation& creation;
+        ContainerRemoval& removal;
+        SetupReport& report;
+    };
+    using Identifiers = ZOREntitlementMapping::Identifiers;
     /// Group identifier to container path.
     using Paths = std::map<std::string, std::string, std::less<>>;
     using References = GroupReferences;
 
-    /// `services` may still be in the making.
-    ZORGroupManager(const Log& log, StoreServices& services) : log_(log), services_(services) {}
+    explicit ZORGroupManager(const Needs& needs) : needs_(needs) {}
     ZORGroupManager(const ZORGroupManager&) = delete;
     ZORGroupManager& operator=(const ZORGroupManager&) = delete;
 
     /// The containers of an identifier's groups (of the system groups for user 499), made where they are missing. A
     /// group whose container cannot be had is left out. Takes the all-identifiers lock for writing. `identifier`
     /// nullptr: error 11; 40.
-    Result<Paths> groupContainerPathsForUser(std::uint32_t userId, ZORClientConnection& clientConnection,
-                                             const std::string* identifier);
+    Result<Paths> groupContainerPathsForUser(std::uint32_t userId, const Caller& caller, const std::string* identifier);
     /// The application groups of an identifier. `identifier` nullptr: error 11; 40.
     Result<std::vector<std::string>> groupContainerIdentifiersForUser(std::uint32_t userId,
                                                                       const std::string* identifier);
 
-    /// Stages the containers of groups that lose their last reference by a change of `identifier`. `map` is the
-    /// entitlement map before the change; the caller holds the all-identifiers lock for writing.
+    /// Stages the containers of groups that lose their last reference by a change of `identifier` that has not been
+    /// settled: the map still holds what was before.
     void handleChangeFromOldGroupContainerIds(Identifiers oldGroups, const Identifiers& newGroups, GroupType type,
-                                              const std::string& identifier, const plist::Dictionary& map);
+                                              const std::string& identifier, const AllIdentifiersWriteLock& lock);
     /// Stages every group container that the map does not refer to. At the boot, before clients are served.
     std::uint64_t reconcileGroupContainersOfType(GroupType type);
 
 private:
     /// nullopt, logged, when the map is known to be incomplete.
-    [[nodiscard]] std::optional<References> _copyReferenceCountSetOfType(GroupType type,
-                                                                         const plist::Dictionary& map) const;
+    [[nodiscard]] std::optional<References> _copyReferenceCountSetOfType(GroupType type);
     void _removeReferenceForGroupIdentifiers(const std::vector<std::string>& groups, GroupType type,
-                                             const std::string& identifier, const plist::Dictionary& map);
+                                             const std::string& identifier, const AllIdentifiersWriteLock& lock);
     void _removeGroupContainersIfNeededforUser(std::uint32_t userId, ContainerClass containerClass,
                                                const std::string& group, const std::string& identifier,
-                                               const References& references);
+                                               const References& references, const AllIdentifiersWriteLock& lock);
     std::uint64_t _cleanupUnreferencedGroupContainersForUser(std::uint32_t userId, ContainerClass containerClass,
                                                              const References& references);
-    bool stageGroupContainer(const char* function, std::uint32_t userId, const ZORMetadata& record,
-                             UseLocking useLocking);
+    /// Says it where a container could not be staged; whether it was.
+    bool isStaged(const char* function, std::uint32_t userId, const ZORMetadata& record, const Result<void>& staged);
     /// Every user that has groups of the type, and a home to have them in.
     void forEachUser(GroupType type, const std::function<void(std::uint32_t)>& function);
 
-    const Log& log_;
-    StoreServices& services_;
+    const Needs needs_;
 };
 
 } // namespace zor

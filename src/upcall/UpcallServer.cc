@@ -2,8 +2,6 @@
 #include "upcall/UpcallServer.h"
 
 #include "base/UserIdentity.h"
-#include "operations/StoreServices.h"
-#include "operations/ZORClientConnection.h"
 #include "plist/Value.h"
 #include "store/Names.h"
 
@@ -40,14 +38,13 @@ const char* orNull(const std::optional<std::string>& path) {
 /// Looks up one container after the other, making what is missing, and keeps whether all could be had.
 class Lookups {
 public:
-    Lookups(const Log& log, ZORClientConnection& client) : log_(log), client_(client) {}
+    Lookups(const Log& log, Creation& creation) : log_(log), creation_(creation) {}
 
     /// `failure` is what the line about a failure begins with.
     std::optional<std::string> pathOf(std::uint32_t userId, const std::string& identifier,
                                       ContainerClass containerClass, const char* failure) {
-        auto found = client_.createOrLookupContainerForUser(
-            userId, &identifier, containerClass,
-            {.createIfNecessary = true, .transient = false, .useLocking = UseLocking::yes});
+        auto found = creation_.createOrLookupContainerForUser(caller_, userId, &identifier, containerClass,
+                                                              {.createIfNecessary = true, .transient = false});
         if (found)
             return std::move(found->path);
         log_.write(logLevelError, function, "%s Failed with error: %llu", failure,
@@ -69,14 +66,15 @@ public:
 
 private:
     const Log& log_;
-    ZORClientConnection& client_;
+    Creation& creation_;
+    const Caller caller_ = Caller::daemonItself();
     bool success_ = true;
 };
 
 } // namespace
 
-UpcallServer::UpcallServer(StoreServices& services, const platform::UpcallPort& port)
-    : services_(services), log_(services.log), port_(port) {}
+UpcallServer::UpcallServer(const Needs& needs, const platform::UpcallPort& port)
+    : needs_(needs), log_(needs.log), port_(port) {}
 
 std::vector<std::uint8_t> UpcallServer::answer(const platform::UpcallPacket& packet) {
     std::vector<std::uint8_t> reply;
@@ -104,7 +102,7 @@ void UpcallServer::demux_server(const platform::UpcallPacket& request, std::vect
     }
     ZOR_LOG(log_, logLevelDebug, "handling incomming request for container_manager server");
     std::vector<std::uint8_t> replyBuffer;
-    const auto outcome = services_.boundary.run({function, __LINE__}, [&]() -> Result<ReturnCode> {
+    const auto outcome = needs_.boundary.run({function, __LINE__}, [&]() -> Result<ReturnCode> {
         return server_get_process_containers(*buffer, *request.senderPid, replyBuffer);
     });
     const ReturnCode code = outcome ? *outcome : ReturnCode::noBuffer;
@@ -153,23 +151,20 @@ ReturnCode UpcallServer::readRequest(upcall::Bytes bytes, ProcessContainersReque
 }
 
 bool UpcallServer::lookUp(const ProcessContainersRequest& request, ProcessContainers& found) {
-    ZORClientConnection& client = *services_.sharedClientConnection;
-    client.setAllowOtherIdLookup(true);
-    client.setAllowGroupIdLookup(true);
-    Lookups lookups(log_, client);
+    Lookups lookups(log_, needs_.creation);
     // Asked before any lock is taken: of a home that does not answer the lookups are then told at once.
-    (void)services_.configuration.homeAnswers(request.personaId);
+    (void)needs_.configuration.homeAnswers(request.personaId);
     if (const std::string* identifier = request.dataContainerIdentifier())
         found.dataContainer = lookups.pathOf(request.personaId, *identifier, ContainerClass::dataApplication,
                                              "createOrLookupContainerForUser:");
     if (request.systemContainerIdentifier)
         found.systemContainer =
-            lookups.pathOf(services_.configuration.users().system, *request.systemContainerIdentifier,
+            lookups.pathOf(needs_.configuration.users().system, *request.systemContainerIdentifier,
                            ContainerClass::dataSystem, "createOrLookupContainerForUser:(system container)");
     found.appGroups = lookups.pathsOf(request.personaId, request.appGroupIdentifiers, ContainerClass::sharedAppGroup,
                                       "createOrLookupGroupContainersForUser:");
     found.systemGroups =
-        lookups.pathsOf(services_.configuration.users().system, request.systemGroupIdentifiers,
+        lookups.pathsOf(needs_.configuration.users().system, request.systemGroupIdentifiers,
                         ContainerClass::sharedSystemGroup, "createOrLookupContainerForUser:(system group container)");
     if (found.dataContainer)
         found.temporaryDirectory =
@@ -179,8 +174,8 @@ bool UpcallServer::lookUp(const ProcessContainersRequest& request, ProcessContai
 
 std::optional<std::string> UpcallServer::homeDirectoryOf(std::uint32_t personaId) {
     if (personaId == rootPersona)
-        return services_.fileManager.resolver().root().path(names::rootHome);
-    ZORPerUserConfiguration* user = services_.configuration.getPerUserConfigurationForUserId(personaId);
+        return needs_.fileManager.resolver().root().path(names::rootHome);
+    ZORPerUserConfiguration* user = needs_.configuration.getPerUserConfigurationForUserId(personaId);
     const auto home = user ? user->userHomeDirectory() : std::nullopt;
     return home ? std::optional(home->path()) : std::nullopt;
 }

@@ -10,7 +10,11 @@
 #pragma once
 
 #include "base/Result.h"
+#include "base/ZORException.h"
+#include "fs/ZORFileManager.h"
+#include "operations/Creation.h"
 #include "platform/ServiceListener.h"
+#include "store/ZORGlobalConfiguration.h"
 #include "upcall/ProcessContainersReply.h"
 #include "upcall/ProcessContainersRequest.h"
 
@@ -20,12 +24,17 @@
 
 namespace zor {
 
-struct StoreServices;
-
 class UpcallServer {
 public:
-    /// Asks in the name of the daemon's own client, whose lookup rights become the widest with the first request.
-    UpcallServer(StoreServices& services, const platform::UpcallPort& port);
+    struct Needs {
+        const Log& log;
+        ExceptionBoundary& boundary;
+        ZORFileManager& fileManager;
+        ZORGlobalConfiguration& configuration;
+        Creation& creation;
+    };
+    /// Asks in the daemon's own name.
+    UpcallServer(const Needs& needs, const platform::UpcallPort& port);
     UpcallServer(const UpcallServer&) = delete;
     UpcallServer& operator=(const UpcallServer&) = delete;
 
@@ -43,7 +52,7 @@ private:
     void logContainers(const ProcessContainersRequest& request, const ProcessContainers& containers) const;
     void copyReply(const sb_packbuff& packbuff, std::vector<std::uint8_t>& reply) const;
 
-    StoreServices& services_;
+    const Needs needs_;
     const Log& log_;
     const platform::UpcallPort& port_;
 };

@@ -355,7 +355,7 @@ TEST(StoreCheckTest, FindsInfoThatWasNotWritten) {
     const auto findings = check();
     ASSERT_EQ(findings.size(), 1U) << textOf(findings);
     EXPECT_EQ(findings[0].code, FindingCode::infoUnsaved);
-    EXPECT_TRUE(store.world.services().store().someInfoIsNotSaved);
+    EXPECT_TRUE(store.world.services().store().infoValues.someIsNotSaved());
     store.world.disk().disarm();
     EXPECT_TRUE(set());
     EXPECT_EQ(textOf(check()), "");

@@ -2,7 +2,7 @@
 // The first launch of a boot over a device that an older system left, with each of its calls failing, the daemon ending
 // at each, and the power going after each.
 #include "crash/Scenarios.h"
-#include "operations/ZOREntitlementMapping.h"
+#include "store/ZOREntitlementMapping.h"
 #include "support/FaultLoop.h"
 #include "support/LongRun.h"
 #include "support/PowerCut.h"

@@ -147,23 +147,25 @@ struct StoppedReplace {
 StoppedReplace stopAfterFirstMove(Device& device, const Acknowledged& old, OldOne kind) {
     const Acknowledged fresh = makeWithContent(device, true, "new");
     const UUID uuid = UUID::random();
-    StoreServices& services = device.daemon->world.services().store();
+    Composition& services = device.daemon->world.services();
     const FileURL oldUrl = FileURL::directory(old.path);
     const bool keepsUuid = kind == OldOne::replacedAndUuidKept;
     if (keepsUuid) {
         const auto record =
-            services.cache.containerForUser(mobileUser, changed.containerClass, &changed.identifier, true).value();
+            services.cache().containerForUser(mobileUser, changed.containerClass, &changed.identifier, true).value();
         record->setUuid(uuidOf(old));
-        must(record->writeMetadataToDiskWithError(services.log, services.fileManager).has_value(), "no old UUID");
+        must(record->writeMetadataToDiskWithError(services.log(), services.defaultManager()).has_value(),
+             "no old UUID");
     }
     const ReplaceJournal journal{
         .oldUrl = oldUrl,
         .newUrl = FileURL::directory(fresh.path),
-        .stagingUrl = services.configuration.stagingDirectory().appendingDirectory(uuid.string()),
+        .stagingUrl = services.configuration().stagingDirectory().appendingDirectory(uuid.string()),
         .destUrl = keepsUuid ? oldUrl : oldUrl.deletingLastPathComponent().appendingDirectory(nameOf(fresh.path))};
-    const auto written = journal._writeToDiskReplaceAt(
-        services.log, services.fileManager, ReplaceJournal::urlFor(services.configuration.replaceDirectory(), uuid));
-    must(written && services.fileManager.moveItemAtURL(oldUrl, journal.stagingUrl) &&
+    const auto written =
+        journal._writeToDiskReplaceAt(services.log(), services.defaultManager(),
+                                      ReplaceJournal::urlFor(services.configuration().replaceDirectory(), uuid));
+    must(written && services.defaultManager().moveItemAtURL(oldUrl, journal.stagingUrl) &&
              device.disk->syncFileSystem(openDirectory(journal.stagingUrl.path()).get()) == 0,
          "no stopped replace");
     return {.newUrl = journal.newUrl, .destUrl = journal.destUrl};
@@ -194,7 +196,7 @@ Scenario recoveryOfADone(const std::string& name, OldOne kind) {
         "recovery of a done " + name,
         [=](Device& device, const Acknowledged& old) { *stopped = stopAfterFirstMove(device, old, kind); },
         [=](Device& device, const Acknowledged&) {
-            if (device.daemon->world.services().store().fileManager.moveItemAtURL(stopped->newUrl, stopped->destUrl))
+            if (device.daemon->world.services().defaultManager().moveItemAtURL(stopped->newUrl, stopped->destUrl))
                 device.daemon->launch();
             return true;
         },

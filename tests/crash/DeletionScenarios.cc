@@ -14,7 +14,8 @@ const std::string app = "com.example.app";
 
 bool registerApp(Device& device, const std::string& identifier, const plist::Dictionary& entitlements,
                  const plist::Dictionary& options = {}) {
-    const ErrorCode code = device.daemon->entitlements().processEntitlements(&entitlements, &identifier, &options);
+    const ErrorCode code = device.daemon->world.services().store().entitlementChange.processEntitlements(
+        &entitlements, &identifier, &options);
     return code == ErrorCode::success;
 }
 
@@ -154,7 +155,7 @@ Scenario firstUseOfGroups() {
                 Composition& composition = device.daemon->world.services();
                 for (const Request& request : requests) {
                     const auto paths = composition.groups().groupContainerPathsForUser(
-                        request.userId, *composition.sharedClientConnection(), &app);
+                        request.userId, composition.sharedClientConnection()->caller(), &app);
                     if (!paths || !paths->contains(request.identifier))
                         continue;
                     device.promise(request, paths->at(request.identifier));

@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // Conditions that a boot may meet, and what they may not cost: each row is a device, one boot or more over it, and a
 // look at what has to be there afterwards.
-#include "operations/ZOREntitlementMapping.h"
 #include "platform/ServiceListener.h"
+#include "store/ZOREntitlementMapping.h"
 #include "support/EncryptedDisk.h"
 #include "world/World.h"
 
@@ -44,7 +44,7 @@ void putWithGroup(World& world, const std::string& identifier, const std::string
 }
 
 void store(World& world, const std::string& identifier, const Dictionary& entitlements) {
-    ASSERT_EQ(world.services().entitlements().processEntitlements(&entitlements, &identifier, nullptr),
+    ASSERT_EQ(world.services().store().entitlementChange.processEntitlements(&entitlements, &identifier, nullptr),
               ErrorCode::success);
 }
 
@@ -269,7 +269,7 @@ TEST(BootConditions, CostNothing) {
              // As the other program left it.
              const Dictionary byCaller{{std::string(entitlementMapKeys::registeredByCaller), true}};
              const Dictionary others{{appGroups, Array{"group.a", "group.b"}}};
-             ASSERT_EQ(world.services().entitlements().processEntitlements(
+             ASSERT_EQ(world.services().store().entitlementChange.processEntitlements(
                            &others, std::make_unique<std::string>("app").get(), &byCaller),
                        ErrorCode::success);
              boot(world);

@@ -246,7 +246,7 @@ TEST_F(Create, LookupsWithoutTheLockGiveWay) {
          },
          true},
         {"its place is not on the disk for good", [](const auto& found) { found.record->setDurable(false); }, true},
-        {"the classes have not been read", [&](const auto&) { world.services().store().cache.dropAll(); }, true},
+        {"the classes have not been read", [&](const auto&) { world.services().cache().dropAll(); }, true},
         {"the home is another one",
          [&](const auto&) {
              const std::string home = world.path("private/var/mobile");
@@ -260,8 +260,8 @@ TEST_F(Create, LookupsWithoutTheLockGiveWay) {
         SCOPED_TRACE(row.what);
         const std::string id = "id" + std::to_string(&row - rows);
         row.disturb(world.make(id));
-        auto& store = world.services().store();
-        EXPECT_EQ(!lookUpUndisturbed(store.locks, store.cache, mobile, application, id), row.givesWay);
+        Composition& store = world.services();
+        EXPECT_EQ(!lookUpUndisturbed(store.locks(), store.cache(), mobile, application, id), row.givesWay);
     }
 }
 

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Taking containers out of the store: what a batch stages and says, what goes with each class, disks that refuse, and
 // owners who swap what is to be deleted.
-#include "operations/ZOREntitlementMapping.h"
+#include "store/ZOREntitlementMapping.h"
 #include "world/World.h"
 
 #include <atomic>
@@ -94,8 +94,8 @@ TEST_F(Deletion, WhatGoesWithEachClass) {
         SCOPED_TRACE(number);
         const auto containerClass = static_cast<ContainerClass>(number);
         const bool perUser = isPerUserClass(containerClass);
-        (void)mapping.processEntitlements(&entitlements, &own, nullptr);
-        (void)mapping.processEntitlements(&entitlements, &child, &isChild);
+        (void)world.services().store().entitlementChange.processEntitlements(&entitlements, &own, nullptr);
+        (void)world.services().store().entitlementChange.processEntitlements(&entitlements, &child, &isChild);
         ASSERT_EQ(mapping.entryCount(), 3U); // two identifiers, one map of children
         const FoundContainer container = world.make(own, containerClass);
         for (const std::string& identifier : {own, std::string("other")})

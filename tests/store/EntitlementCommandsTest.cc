@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // Deletion, entitlements and shared containers from a request's keys to a reply's, and the registration of a peer by
 // its own messages.
-#include "operations/ZOREntitlementMapping.h"
 #include "store/DispatchFixture.h"
+#include "store/ZOREntitlementMapping.h"
 
 #include <set>
 
@@ -189,7 +189,7 @@ TEST_F(Shared, PeersRegisterThemselves) {
     EXPECT_EQ(groupsIn(request(ask)), (std::set<std::string>{"h"}));
     EXPECT_EQ(registered(), (Dictionary{{"app", changed}, {byCaller, flag}}));
     const Dictionary child{{"k", 1}};
-    (void)mapping().processEntitlements(
+    (void)world.services().store().entitlementChange.processEntitlements(
         &child, std::make_unique<std::string>("child").get(),
         std::make_unique<Dictionary>(Dictionary{{"com.veltra.Zorvane.ParentBundleID", "app"}}).get());
     EXPECT_EQ(registered().size(), 4U);

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // What a change of entitlements makes of the map and its file, of system containers and of groups; reconciliation; and
 // what a lost file keeps from being deleted.
-#include "operations/ZOREntitlementMapping.h"
+#include "store/ZOREntitlementMapping.h"
 #include "operations/ZORGroupManager.h"
 #include "world/World.h"
 

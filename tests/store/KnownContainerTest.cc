@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // What is asked of one container by its UUID: info values, its record, its structure, its directory's name, its size.
-#include "operations/ZOREntitlementMapping.h"
+#include "store/ZOREntitlementMapping.h"
 #include "operations/ZORGroupManager.h"
 #include "support/OpenWatch.h"
 #include "world/World.h"
@@ -142,14 +142,14 @@ TEST_F(Known, DiskUsageIsKeptForBundlesAlone) {
     grow("/zero");
     (void)usage(bundle);
     grow("/one");
-    world.services().store().usageSettledTime = {};
+    world.services().store().diskUsage.settledTime = {};
     const std::uint64_t bundleBytes = usage(bundle);
     const std::uint64_t dataBytes = usage(data);
     const std::uint64_t transientBytes = usage(transient);
     EXPECT_GE(bundleBytes, 200'000U);
     grow("/two");
     world.restart();
-    world.services().store().usageSettledTime = {};
+    world.services().store().diskUsage.settledTime = {};
     EXPECT_EQ(usage(bundle), bundleBytes);
     EXPECT_GE(usage(data), dataBytes + 100'000);
     EXPECT_GE(usage(transient), transientBytes + 100'000); // it is being filled
@@ -169,7 +169,7 @@ TEST_F(Known, DiskUsageIsKeptForBundlesAlone) {
 // Goal: a size is not kept for a container that moved while it was measured. Method: a renaming in the moment in which
 // the walk opens a directory.
 TEST_F(Known, ASizeIsNotKeptForWhatMovedMeanwhile) {
-    world.services().store().usageSettledTime = {};
+    world.services().store().diskUsage.settledTime = {};
     const FoundContainer bundle = world.make("com.example", ContainerClass::bundleApplication);
     const Address address = addressOf(bundle);
     world.write(world.relative(bundle.path) + "/a/file", "x");

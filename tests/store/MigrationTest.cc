@@ -274,7 +274,9 @@ TEST(Migration, GroupIdentifiers) {
     putWithGroup(world, std::string(mobileContainers) + "/Data/KolvexPlugin", 4, "com.example.b", secondUuid);
     world.load();
     world.log.take();
-    const auto migrate = [&] { return world.services().entitlements().migrateAppGroupIdsFromDataContainersToFile(); };
+    const auto migrate = [&] {
+        return world.services().store().entitlementPasses.migrateAppGroupIdsFromDataContainersToFile();
+    };
     // The second file of a container; the map's own files come between.
     world.disk().arm({.point = 2, .error = ENOSPC, .span = FaultSpan::fromThenOn, .filter = [&](const auto& call) {
                           return call.call == DiskCall::createFile &&
@@ -314,10 +316,10 @@ TEST(Migration, GroupsStayUntilTheirIdentifiersAreMigrated) {
     boot(world);
     EXPECT_EQ(world.names(groups).size(), 2U);
     world.restart();
-    ZOREntitlementMapping& mapping = world.services().entitlements();
     const Dictionary entitled{{std::string(entitlementKeys::applicationGroups), Array{"group.a"}}};
     for (const Dictionary* entitlements : {&entitled, static_cast<const Dictionary*>(nullptr)})
-        ASSERT_EQ(mapping.processEntitlements(entitlements, &other, nullptr), ErrorCode::success);
+        ASSERT_EQ(world.services().store().entitlementChange.processEntitlements(entitlements, &other, nullptr),
+                  ErrorCode::success);
     EXPECT_EQ(world.names(groups).size(), 2U);
     ASSERT_EQ(::unlink(world.path(plugins).c_str()), 0);
     boot(world);
@@ -340,13 +342,13 @@ TEST(Migration, UnentitledSystemContainers) {
     world.load();
     world.log.take();
     ZOREntitlementMapping& mapping = world.services().entitlements();
-    EXPECT_EQ(mapping.reconcileSystemContainers(), 0U);
+    EXPECT_EQ(world.services().store().entitlementPasses.reconcileSystemContainers(), 0U);
     EXPECT_EQ(world.complaints("reconcileSystemContainers").size(), 1U);
     ASSERT_EQ(::unlink(world.path(entitlementFile + ".unreadable").c_str()), 0);
     const std::string key(entitlementKeys::systemContainer);
     ASSERT_TRUE(mapping._setEntitlementDictionaryValues({Dictionary{{key, true}}, Dictionary{{key, false}}},
                                                         {"entitled", "not entitled"}));
-    EXPECT_EQ(mapping.reconcileSystemContainers(), 2U);
+    EXPECT_EQ(world.services().store().entitlementPasses.reconcileSystemContainers(), 2U);
     EXPECT_EQ(world.names(parentOf(system)), std::vector<std::string>{firstUuid});
     EXPECT_EQ(world.complaints("reconcileSystemContainers").size(), 2U);
 }

@@ -341,7 +341,7 @@ TEST_F(Protection, FilesWithoutProtection) {
     EXPECT_EQ(classOf(metadata), 4);
     const plist::Dictionary entitlements{
         {std::string(entitlementKeys::applicationGroups), plist::Array{plist::Value("group")}}};
-    ASSERT_EQ(world.services().entitlements().processEntitlements(&entitlements, &identifier, nullptr),
+    ASSERT_EQ(world.services().store().entitlementChange.processEntitlements(&entitlements, &identifier, nullptr),
               ErrorCode::success);
     EXPECT_EQ(classOf("private/var/root/Library/Zorvane/zor_entitlements.plist"), 4);
 }

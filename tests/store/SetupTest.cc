@@ -138,7 +138,8 @@ TEST(Setup, BootAndLaunch) {
     const std::string identifier = "com.example";
     const plist::Dictionary groups{{std::string(entitlementKeys::applicationGroups), plist::Array{identifier}},
                                    {std::string(entitlementKeys::systemContainer), true}};
-    ASSERT_EQ(world.services().entitlements().processEntitlements(&groups, &identifier, nullptr), ErrorCode::success);
+    ASSERT_EQ(world.services().store().entitlementChange.processEntitlements(&groups, &identifier, nullptr),
+              ErrorCode::success);
     std::vector<std::string> live;
     std::vector<std::string> transient;
     for (const auto& [userId, containerClass] :

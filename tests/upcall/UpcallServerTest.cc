@@ -128,7 +128,7 @@ TEST(UpcallServer, AnswersTheKernelAlone) {
 
     World world;
     const NoPort port;
-    UpcallServer server(world.services().store(), port);
+    UpcallServer server(world.services().upcallNeeds(), port);
     EXPECT_EQ(replyIn(server.answer({.bytes = good, .senderPid = {}, .senderUserId = {}})).returnCode, -309);
     const ByteVector another = with(good, 12, 0);
     EXPECT_EQ(replyIn(server.answer({.bytes = another, .senderPid = {}, .senderUserId = {}})).returnCode, -300);
@@ -266,7 +266,7 @@ TEST(UpcallServer, TracesNoContainerAfterAFailure) {
 TEST(UpcallServer, AnswersWhatCannotBeSent) {
     World world;
     NoPort port;
-    UpcallServer server(world.services().store(), port);
+    UpcallServer server(world.services().upcallNeeds(), port);
     const ByteVector packet = Items().string(0, "com.example").number(3, mobile).packet();
     const platform::UpcallPacket sent{.bytes = packet, .senderPid = 0, .senderUserId = 0};
     const ByteVector whole = server.answer(sent);

@@ -3,9 +3,6 @@
 #include "base/UserIdentity.h"
 #include "daemon/commands/Commands.h"
 #include "daemon/commands/Request.h"
-#include "operations/ZOREntitlementMapping.h"
-#include "operations/ZORGroupManager.h"
-#include "store/ZORWhitelist.h"
 
 #include <algorithm>
 
@@ -19,7 +16,9 @@ void replyWithGroupPaths(CommandContext& context, std::uint32_t userId) {
     const std::string* identifier = ownIdentifierByDefault(context);
     if (!mayAskFor(context, identifier))
         return;
-    const auto paths = context.services.groups.groupContainerPathsForUser(userId, *context.client, identifier);
+    context.client->setAllowGroupIdLookup(true);
+    const auto paths =
+        context.operations.groups.groupContainerPathsForUser(userId, context.client->caller(), identifier);
     if (!paths) {
         context.error = paths.error().replyCode();
         return;
@@ -32,8 +31,9 @@ void replyWithGroupPaths(CommandContext& context, std::uint32_t userId) {
 
 /// The path of a group that the client is entitled to; nullopt when it cannot be had.
 std::optional<std::string> entitledGroupPath(CommandContext& context, const std::string& group) {
-    const auto paths = context.services.groups.groupContainerPathsForUser(
-        context.services.configuration.users().system, *context.client, ownIdentifierByDefault(context));
+    context.client->setAllowGroupIdLookup(true);
+    const auto paths = context.operations.groups.groupContainerPathsForUser(
+        context.operations.configuration.users().system, context.client->caller(), ownIdentifierByDefault(context));
     if (!paths)
         return std::nullopt;
     const auto found = paths->find(group);
@@ -43,14 +43,14 @@ std::optional<std::string> entitledGroupPath(CommandContext& context, const std:
 std::optional<std::string> wellKnownGroupPath(CommandContext& context, const std::string& group) {
     context.client->setAllowGroupIdLookup(true);
     const auto found =
-        context.client->createOrLookupContainerForUser(context.services.configuration.users().system, &group,
+        context.client->createOrLookupContainerForUser(context.operations.configuration.users().system, &group,
                                                        ContainerClass::sharedSystemGroup, {.createIfNecessary = true});
     return found ? std::optional(found->path) : std::nullopt;
 }
 
 bool isEntitledTo(CommandContext& context, const std::string& group) {
     const auto& own = context.client->clientBundleIdentifier();
-    const auto groups = own ? context.services.entitlements.systemGroupIdentifiersForIdentifier(*own) : std::nullopt;
+    const auto groups = own ? context.operations.entitlements.systemGroupIdentifiersForIdentifier(*own) : std::nullopt;
     return groups && std::ranges::find(*groups, group) != groups->end();
 }
 
@@ -78,7 +78,7 @@ void getGroupContainerIdentifiers(CommandContext& context) {
     const std::string* identifier = ownIdentifierByDefault(context);
     if (!user || !mayAskFor(context, identifier))
         return;
-    const auto groups = context.services.groups.groupContainerIdentifiersForUser(*user, identifier);
+    const auto groups = context.operations.groups.groupContainerIdentifiersForUser(*user, identifier);
     if (!groups) {
         context.error = groups.error().replyCode();
         return;
@@ -91,10 +91,10 @@ void getSystemContainerPath(CommandContext& context) {
     const auto& own = context.client->clientBundleIdentifier();
     const bool isOwn = identifier && own && *identifier == *own;
     if (!isOwn && identifier && !context.client->allowOtherIdLookup() &&
-        context.services.whitelist.systemContainerIdIsWellknown(*identifier))
+        context.operations.whitelist.systemContainerIdIsWellknown(*identifier))
         context.client->setAllowOtherIdLookup(true);
     const auto found =
-        context.client->createOrLookupContainerForUser(context.services.configuration.users().system, identifier,
+        context.client->createOrLookupContainerForUser(context.operations.configuration.users().system, identifier,
                                                        ContainerClass::dataSystem, {.createIfNecessary = true});
     if (found)
         context.reply.set(keys::replyPath, found->path);
@@ -103,7 +103,7 @@ void getSystemContainerPath(CommandContext& context) {
 }
 
 void getSystemGroupContainerPaths(CommandContext& context) {
-    replyWithGroupPaths(context, context.services.configuration.users().system);
+    replyWithGroupPaths(context, context.operations.configuration.users().system);
 }
 
 void getSystemGroupContainerPath(CommandContext& context) {
@@ -112,7 +112,7 @@ void getSystemGroupContainerPath(CommandContext& context) {
     std::optional<std::string> path;
     if (group && isEntitledTo(context, *group)) {
         path = entitledGroupPath(context, *group);
-    } else if (group && context.services.whitelist.systemGroupContainerIdIsWellknown(*group)) {
+    } else if (group && context.operations.whitelist.systemGroupContainerIdIsWellknown(*group)) {
         path = wellKnownGroupPath(context, *group);
     } else {
         context.log.write(logLevelError, function, "%s is not entitled for system group identifier: %s",
@@ -132,7 +132,7 @@ void getSystemGroupContainerPath(CommandContext& context) {
 void processEntitlements(CommandContext& context) {
     if (!isDictionaryOrAbsent(context, keys::entitlements) || !isDictionaryOrAbsent(context, keys::optionsDictionary))
         return;
-    context.error = context.services.entitlements.processEntitlements(
+    context.error = context.operations.entitlementChange.processEntitlements(
         context.request.dictionary(keys::entitlements), context.request.string(keys::identifier),
         context.request.dictionary(keys::optionsDictionary));
 }

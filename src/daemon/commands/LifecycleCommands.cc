@@ -69,7 +69,7 @@ void getDiskUsage(CommandContext& context) {
 }
 
 void retryTest(CommandContext& context) {
-    if (!context.services.internalBuild.isInternalBuild()) {
+    if (!context.operations.internalBuild.isInternalBuild()) {
         context.log.write(logLevelError, __func__, "People really shouldn't be calling this on non-internal installs!");
         return;
     }

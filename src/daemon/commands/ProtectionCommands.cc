@@ -2,7 +2,6 @@
 // Changing the data-protection class of a container. It replies itself, when the change has ended.
 #include "daemon/commands/Commands.h"
 #include "daemon/commands/Request.h"
-#include "operations/ZORDataProtectionManager.h"
 
 namespace zor::commands {
 
@@ -28,7 +27,7 @@ void setDataProtection(CommandContext& context) {
         reply(context.error);
         return;
     }
-    context.services.dataProtection.setDataProtectionOnDataContainerForUser(
+    context.operations.dataProtection.setDataProtectionOnDataContainerForUser(
         {.userId = *user,
          .identifier = stringIn(context.request, keys::identifier),
          .containerClass = containerClass,

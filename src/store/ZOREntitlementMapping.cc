@@ -1,7 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "operations/ZOREntitlementMapping.h"
+#include "store/ZOREntitlementMapping.h"
 
+#include "base/UserIdentity.h"
 #include "fs/DictionaryFile.h"
+#include "ipc/Keys.h"
+#include "plist/Value.h"
 #include "store/Names.h"
 
 #include <algorithm>
@@ -15,13 +18,19 @@ using platform::MutexLock;
 
 namespace {
 
+constexpr const char* processFunction = "_onQueue_processEntitlements";
 constexpr const char* setFunction = "_setEntitlementDictionaryValues";
+
+/// What is stored under the map's own keys is the daemon's; anything else there counts as nothing.
+plist::Dictionary copyOf(const plist::Dictionary* dictionary) {
+    return dictionary ? *dictionary : plist::Dictionary();
+}
 
 } // namespace
 
 ZOREntitlementMapping::ZOREntitlementMapping(const Log& log, ZORFileManager& fileManager,
-                                             ZORGlobalConfiguration& configuration, StoreServices& services)
-    : log_(log), fileManager_(fileManager), configuration_(configuration), services_(services),
+                                             ZORGlobalConfiguration& configuration, MigrationMarkers& markers)
+    : log_(log), fileManager_(fileManager), configuration_(configuration), markers_(markers),
       entitlementMappingFileUrl_(configuration.libraryDirectory().appendingFile(names::entitlementFile)),
       unreadableFileUrl_(
           entitlementMappingFileUrl_.deletingLastPathComponent().appendingFile(names::unreadableEntitlementFile)),
@@ -207,6 +216,152 @@ ZOREntitlementMapping::_onQueue_systemGroupIdentifiersForIdentifier(std::string_
             return true;
         });
     return groups;
+}
+
+void ZOREntitlementMapping::Plan::add(std::string_view key, plist::Dictionary value) {
+    keys.emplace_back(key);
+    values.push_back(std::move(value));
+}
+
+void ZOREntitlementMapping::_onQueue_stageChildBundles(Plan& plan, const std::string& identifier,
+                                                       const plist::Dictionary* options, SayStaging say) const {
+    const plist::Dictionary* stored = entitlementMappingDict_.dictionary(entitlementMapKeys::childPluginBundleIds);
+    const std::string* parent = options ? options->string(ipc::keys::parentBundleIdOption) : nullptr;
+    if (!parent) {
+        if (!stored || !stored->find(identifier))
+            return;
+        plist::Dictionary childMap = *stored;
+        childMap.erase(identifier);
+        plan.add(entitlementMapKeys::childPluginBundleIds, std::move(childMap));
+        return;
+    }
+    const plist::Array* children = stored ? stored->array(*parent) : nullptr;
+    if (children && std::ranges::find(*children, plist::Value(identifier)) != children->end())
+        return;
+    plist::Array childList = children ? *children : plist::Array();
+    childList.emplace_back(identifier);
+    if (say == SayStaging::yes && log_.writes(logLevelDebug)) {
+        const plist::Value shown(childList);
+        log_.write(logLevelDebug, processFunction, "Staging Child Bundles: %s for parent ID: %s by appending: %s",
+                   plist::describe(&shown).c_str(), ZOR_SHOWN(*parent), ZOR_SHOWN(identifier));
+    }
+    plist::Dictionary childMap = copyOf(stored);
+    childMap.set(*parent, std::move(childList));
+    plan.add(entitlementMapKeys::childPluginBundleIds, std::move(childMap));
+}
+
+void ZOREntitlementMapping::_onQueue_stageFlag(Plan& plan, std::string_view key, const std::string& identifier,
+                                               const plist::Dictionary* options) const {
+    const plist::Dictionary* stored = entitlementMappingDict_.dictionary(key);
+    const bool wanted = options && options->isTrue(key);
+    const bool isThere = stored && stored->find(identifier);
+    if (wanted == isThere)
+        return;
+    plist::Dictionary flags = copyOf(stored);
+    if (wanted)
+        flags.set(identifier, true);
+    else
+        flags.erase(identifier);
+    plan.add(key, std::move(flags));
+}
+
+bool ZOREntitlementMapping::_onQueue_stage(Plan& plan, const plist::Dictionary* entitlements,
+                                           const std::string& identifier, const plist::Dictionary* options,
+                                           SayStaging say) const {
+    _onQueue_stageChildBundles(plan, identifier, options, say);
+    _onQueue_stageFlag(plan, entitlementMapKeys::registeredByCaller, identifier, options);
+    _onQueue_stageFlag(plan, entitlementMapKeys::placeholder, identifier, options);
+    // An empty dictionary is how nothing is stored.
+    const bool wanted = entitlements && !entitlements->empty();
+    const plist::Dictionary* stored = entitlementsOf(identifier);
+    const bool entitlementsChange =
+        wanted ? !stored || *stored != *entitlements : entitlementMappingDict_.find(identifier) != nullptr;
+    if (entitlementsChange)
+        plan.add(identifier, copyOf(entitlements));
+    return entitlementsChange;
+}
+
+void ZOREntitlementMapping::_onQueue_stageReleases(Plan& plan, const plist::Dictionary* entitlements,
+                                                   const std::string& identifier) const {
+    const bool keepsSystemContainer = entitlements && entitlements->isTrue(entitlementKeys::systemContainer);
+    plan.releasesSystemContainer = !keepsSystemContainer && _onQueue_identifierHasSystemContainer(identifier);
+    auto& [applicationGroups, systemGroups] = plan.groups;
+    applicationGroups.before = _onQueue_appGroupIdentifiersForIdentifier(identifier);
+    applicationGroups.after =
+        _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, entitlementKeys::applicationGroups);
+    systemGroups.after =
+        _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, entitlementKeys::systemGroups);
+    if (!systemGroups.after || systemGroups.after->empty())
+        systemGroups.after = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements,
+                                                                           entitlementKeys::systemGroupContainers);
+    systemGroups.before = _onQueue_systemGroupIdentifiersForIdentifier(identifier);
+}
+
+ZOREntitlementMapping::Plan ZOREntitlementMapping::plan(const plist::Dictionary* entitlements,
+                                                        const std::string& identifier, const plist::Dictionary* options,
+                                                        const AllIdentifiersWriteLock& /*held*/) {
+    const MutexLock held(entitlementQueue_);
+    Plan plan;
+    if (_onQueue_stage(plan, entitlements, identifier, options, SayStaging::yes))
+        _onQueue_stageReleases(plan, entitlements, identifier);
+    return plan;
+}
+
+Result<void> ZOREntitlementMapping::settle(const Plan& plan, const AllIdentifiersWriteLock& /*held*/) {
+    const MutexLock held(entitlementQueue_);
+    return _onQueue_setEntitlementDictionaryValues(plan.values, plan.keys);
+}
+
+bool ZOREntitlementMapping::_onQueue_changesNothing(const plist::Dictionary* entitlements,
+                                                    const std::string& identifier,
+                                                    const plist::Dictionary* options) const {
+    Plan plan;
+    _onQueue_stage(plan, entitlements, identifier, options, SayStaging::no);
+    return !unsaved_ && plan.keys.empty();
+}
+
+bool ZOREntitlementMapping::changesNothing(const plist::Dictionary* entitlements, const std::string& identifier,
+                                           const plist::Dictionary* options) {
+    const MutexLock held(entitlementQueue_);
+    return _onQueue_changesNothing(entitlements, identifier, options);
+}
+
+bool ZOREntitlementMapping::callerRegistrationIsDue(const std::string& identifier,
+                                                    const plist::Dictionary& entitlements,
+                                                    const plist::Dictionary& options) {
+    const MutexLock held(entitlementQueue_);
+    if (!_onQueue_identifierHasCallerRegisteredEntitlements(identifier))
+        return entitlementMappingDict_.find(identifier) == nullptr;
+    return !_onQueue_changesNothing(&entitlements, identifier, &options);
+}
+
+GroupReferences ZOREntitlementMapping::groupReferences(GroupType type) {
+    const MutexLock held(entitlementQueue_);
+    return groupReferencesIn(entitlementMappingDict_, type, &log_);
+}
+
+std::vector<std::string> ZOREntitlementMapping::childrenOf(const std::string& identifier) {
+    const MutexLock held(entitlementQueue_);
+    std::vector<std::string> names;
+    const plist::Dictionary* childMap = entitlementMappingDict_.dictionary(entitlementMapKeys::childPluginBundleIds);
+    if (const plist::Array* children = childMap ? childMap->array(identifier) : nullptr)
+        for (const plist::Value& child : *children)
+            if (const std::string* name = child.asString())
+                names.push_back(*name);
+    return names;
+}
+
+Result<void> ZOREntitlementMapping::uniteEntitlements(const std::string& identifier, const plist::Dictionary& older) {
+    const MutexLock held(entitlementQueue_);
+    const plist::Dictionary* const entry = entitlementsOf(identifier);
+    return _onQueue_setEntitlementDictionaryValues({entry ? plist::united(*entry, older) : older}, {identifier});
+}
+
+bool ZOREntitlementMapping::groupIdsAreMigrated() {
+    if (groupIdsAreMigrated_ || markers_.existsMigrationFileWithName(names::groupIdMigrationMarker))
+        return true;
+    // Where that user is not, the lists can never be fetched, and there is never a marker.
+    return configuration_.homeOf(configuration_.users().first)->look().state == UserHome::State::noAccount;
 }
 
 bool ZOREntitlementMapping::entitlementsExistForIdentifier(std::string_view identifier) {

@@ -1,16 +1,20 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "operations/ContainerBuilder.h"
+#include "operations/ContainerMaker.h"
 
 #include "fs/AtomicFile.h"
 #include "fs/DictionaryFile.h"
+#include "os/FileDescriptor.h"
 #include "os/Openat2.h"
 #include "plist/Binary.h"
+#include "store/ContainerLayout.h"
 #include "store/Names.h"
 
+#include <cerrno>
 #include <cstring>
 #include <fcntl.h>
 #include <string_view>
 #include <utility>
+#include <vector>
 
 namespace zor {
 
@@ -20,9 +24,43 @@ using platform::openBeneath;
 namespace {
 
 constexpr mode_t closedMode = 0700;
+constexpr const char* function = "createOrLookupContainerForUser";
 constexpr mode_t metadataMode = 0644;
 
-} // namespace
+class ContainerBuilder {
+public:
+    /// Builds `staging` (whose parent exists) by the layout. `staging` has not been made yet.
+    ContainerBuilder(const Log& log, ZORFileManager& fileManager, FileURL staging, const ContainerLayout& layout)
+        : log_(log), fileManager_(fileManager), disk_(fileManager.disk()), staging_(std::move(staging)),
+          layout_(layout) {}
+
+    /// The container's own directory. Error 7.
+    Result<void> _createTopLevelContainerDirectory();
+    /// Its standard subdirectories, in the layout's order, stopping at the first failure. Error 6.
+    Result<void> _createSubDirectories();
+    /// The metadata file of the record: a new file, 0644 and the daemon's own. Error 34.
+    Result<void> writeMetadata(const ZORMetadata& record);
+    /// Modes and owners. Errors 6 and 7.
+    Result<void> giveAway();
+    /// Sees to it that a move cannot become durable before what it moves. Error 34.
+    Result<void> orderBeforeMove(const fs::Durability& durability);
+
+private:
+    /// The descriptor of a subdirectory that a deeper one lies in: the layout names it first.
+    [[nodiscard]] int madeBefore(std::string_view subdirectory) const;
+    ZORError topLevelError(Here here, int number, const char* verb);
+    ZORError subdirectoryError(Here here, const char* subdirectory, int number, const char* verb);
+    Result<void> attributesOf(int directory, mode_t mode, std::uint32_t owner, const char* subdirectory);
+
+    const Log& log_;
+    ZORFileManager& fileManager_;
+    platform::Disk& disk_;
+    const FileURL staging_;
+    const ContainerLayout layout_;
+    platform::FileDescriptor directory_;
+    std::vector<platform::FileDescriptor> subdirectories_; // in the layout's order
+    platform::FileDescriptor metadata_;
+};
 
 ZORError ContainerBuilder::topLevelError(Here here, int number, const char* verb) {
     const ZORError cause = posixError(here, number, "%s of %s failed: %s", verb, staging_.c_str(), errorText(number));
@@ -123,6 +161,74 @@ Result<void> ContainerBuilder::orderBeforeMove(const fs::Durability& durability)
         posixError(ZOR_HERE, -status, "sync of %s failed: %s", names::metadataFile, errorText(-status));
     return makeError(log_, ZOR_HERE, ErrorCode::propertyListNotWritten, &cause, LogFlag::yes,
                      "Failed to write metadata dictionary to URL %s", staging_.c_str());
+}
+
+} // namespace
+
+Result<ContainerMaker::Made> ContainerMaker::make(const Wanted& wanted) {
+    const FileURL staging = needs_.configuration.stagingDirectory().appendingDirectory(UUID::random().string());
+    const auto record = std::make_shared<ZORMetadata>(wanted.userId, UUID::random(), wanted.containerClass,
+                                                      wanted.identifier, nullptr, ContainerPlace(staging));
+    record->setDurable(false);
+    try {
+        if (auto built = build(*record, staging); !built)
+            return cleanUpStaging(staging, std::move(built).error());
+        auto live = moveIntoPlace(wanted, staging);
+        if (!live)
+            return cleanUpStaging(staging, std::move(live).error());
+        return Made{.record = record, .live = std::move(*live)};
+    } catch (...) {
+        (void)needs_.deathRow._moveItemAtURLToDeathRow(staging, StartDeletionThread::yes);
+        throw;
+    }
+}
+
+Result<void> ContainerMaker::build(const ZORMetadata& record, const FileURL& staging) {
+    ContainerBuilder builder(needs_.log, needs_.fileManager, staging, layoutOf(record.containerClass(), record.uid()));
+    TRY(builder._createTopLevelContainerDirectory());
+    TRY(builder._createSubDirectories());
+    TRY(builder.writeMetadata(record));
+    TRY(builder.giveAway());
+    return builder.orderBeforeMove(needs_.durability);
+}
+
+Result<FileURL> ContainerMaker::moveIntoPlace(const Wanted& wanted, const FileURL& staging) {
+    constexpr Here here{function, __LINE__};
+    // The fixed name is the live one's; a transient one has a name with which it can take its place.
+    const std::string* wellKnown =
+        wanted.transient ? nullptr : needs_.whitelist.wellknownContainerForId(wanted.identifier, wanted.containerClass);
+    FileURL live;
+    const auto moved = [&]() -> Result<void> {
+        const auto classDirectory =
+            needs_.configuration.openClassDirectory(wanted.userId, wanted.containerClass, wanted.transient);
+        // A container that was looked for in one home is not made in another.
+        const UserHome* const home =
+            isPerUserClass(wanted.containerClass) ? needs_.configuration.homeOf(wanted.userId) : nullptr;
+        if (!classDirectory || (home && home->generation() != wanted.homeGeneration))
+            return posixError(here, ENOENT, "the home of user %u is not there, or has just changed", wanted.userId);
+        live = classDirectory->url.appendingDirectory(wellKnown ? std::string_view(*wellKnown)
+                                                                : staging.lastPathComponent());
+        const auto from = needs_.fileManager.resolver().openParent(staging);
+        if (!from)
+            return posixError(here, from.error(), "rename of %s to %s failed: %s", staging.c_str(), live.c_str(),
+                              errorText(from.error()));
+        if (!classDirectory->opened)
+            return classDirectory->opened.error();
+        TRY(needs_.fileManager.moveItem(from->directory.get(), staging, classDirectory->opened->get(), live));
+        return {};
+    }();
+    if (!moved)
+        return makeError(needs_.log, here, ErrorCode::moveToLiveFailed, &moved.error(), LogFlag::yes,
+                         "Failed to move staging dir: %s to live dir: %s", staging.c_str(), live.c_str());
+    return live;
+}
+
+ZORError ContainerMaker::cleanUpStaging(const FileURL& staging, ZORError error) {
+    const auto moved = needs_.deathRow._moveItemAtURLToDeathRow(staging, StartDeletionThread::yes);
+    if (moved)
+        return error;
+    return makeError(needs_.log, {function, __LINE__}, ErrorCode::stagingRemovalFailed, &moved.error(), LogFlag::yes,
+                     "Failed to remove staging dir: %s", staging.c_str());
 }
 
 } // namespace zor

@@ -3,10 +3,8 @@
 //
 // One file, loaded once, written whole after each change. The map is touched only on the entitlement queue, which
 // public operations enter synchronously; it is a mutex here, since nothing ever runs on it by itself. Operations whose
-// names begin with _onQueue_ run inside it and never enter it again.
-//
-// Storing and asking is in ZOREntitlementMapping.cc; what a change of entitlements makes of containers is in
-// ZOREntitlementProcessing.cc; what a boot brings in line, in FirstBootPasses.cc.
+// names begin with _onQueue_ run inside it and never enter it again. No container is looked for or moved here: a change
+// is planned, the caller does what it means for containers, and then the change is settled.
 //
 // A stop during a save leaves the old file or the new one. A file that is there but cannot be read is moved aside
 // before anything is saved: as long as it lies there, nothing may be deleted because the map does not mention it
@@ -15,14 +13,16 @@
 
 #include "base/Mutex.h"
 #include "base/Result.h"
-#include "operations/StoreServices.h"
+#include "base/ZORLocks.h"
 #include "plist/Value.h"
 #include "store/EntitlementFile.h"
+#include "store/MigrationMarkers.h"
 #include "store/ZORGlobalConfiguration.h"
 
+#include <array>
 #include <atomic>
+#include <cstdint>
 #include <optional>
-#include <set>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -33,9 +33,9 @@ class ZOREntitlementMapping {
 public:
     using Identifiers = std::optional<std::vector<std::string>>;
 
-    /// Loads the map. `services` may still be in the making; it is used from the first change on.
+    /// Loads the map.
     ZOREntitlementMapping(const Log& log, ZORFileManager& fileManager, ZORGlobalConfiguration& configuration,
-                          StoreServices& services);
+                          MigrationMarkers& markers);
     ZOREntitlementMapping(const ZOREntitlementMapping&) = delete;
     ZOREntitlementMapping& operator=(const ZOREntitlementMapping&) = delete;
 
@@ -48,14 +48,40 @@ public:
     /// Without those that do not begin with "systemgroup.".
     [[nodiscard]] Identifiers systemGroupIdentifiersForIdentifier(std::string_view identifier)
         ZOR_EXCLUDES(entitlementQueue_);
+    /// Who refers to which group.
+    [[nodiscard]] GroupReferences groupReferences(GroupType type) ZOR_EXCLUDES(entitlementQueue_);
+    /// The children recorded for an identifier.
+    [[nodiscard]] std::vector<std::string> childrenOf(const std::string& identifier) ZOR_EXCLUDES(entitlementQueue_);
+    /// A copy of the whole map.
+    [[nodiscard]] plist::Dictionary entitlementMappingDict() ZOR_EXCLUDES(entitlementQueue_);
+    [[nodiscard]] std::size_t entryCount() ZOR_EXCLUDES(entitlementQueue_);
 
-    /// Registers, changes or (`entitlements` nullptr) removes the entitlements of one identifier, under the
-    /// all-identifiers lock held for writing; what changes nothing takes neither that lock nor the disk. System and
-    /// group containers that nothing refers to afterwards are staged for deletion. `options` may be nullptr.
-    /// Codes: success; 18 without an identifier; 11 for an identifier that is a key of the map's own, or a parent that
-    /// is no string; 59 when the file cannot be written; 40.
-    ErrorCode processEntitlements(const plist::Dictionary* entitlements, const std::string* identifier,
-                                  const plist::Dictionary* options) ZOR_EXCLUDES(entitlementQueue_);
+    /// What registering, changing or (`entitlements` nullptr) removing the entitlements of one identifier would store
+    /// and release. Holds as long as nobody changes the map.
+    struct Plan {
+        // To be stored, in this order.
+        std::vector<plist::Dictionary> values;
+        std::vector<std::string> keys;
+        bool releasesSystemContainer = false;
+        /// The groups of one type before and after. Both absent: the entitlements are not among the change, or say
+        /// nothing of such groups.
+        struct Groups {
+            GroupType type;
+            Identifiers before{};
+            Identifiers after{};
+        };
+        std::array<Groups, 2> groups{{{GroupType::application}, {GroupType::system}}};
+
+        void add(std::string_view key, plist::Dictionary value);
+    };
+    [[nodiscard]] Plan plan(const plist::Dictionary* entitlements, const std::string& identifier,
+                            const plist::Dictionary* options, const AllIdentifiersWriteLock& lock)
+        ZOR_EXCLUDES(entitlementQueue_);
+    /// Stores a plan that was made under the same lock. Error 59 when the file cannot be written.
+    Result<void> settle(const Plan& plan, const AllIdentifiersWriteLock& lock) ZOR_EXCLUDES(entitlementQueue_);
+    /// Whether a change would store nothing, and nothing is left to be saved.
+    [[nodiscard]] bool changesNothing(const plist::Dictionary* entitlements, const std::string& identifier,
+                                      const plist::Dictionary* options) ZOR_EXCLUDES(entitlementQueue_);
     /// Whether a peer with this identifier has to be registered as it comes: it has never been, or it was registered so
     /// and processing it with these arguments would change something. One short visit to the queue: asked for every
     /// message.
@@ -64,13 +90,6 @@ public:
     /// Another one after each change of what callerRegistrationIsDue tells; never 0. An answer of it holds while the
     /// generation is the one that was read before it was asked for. One atomic read.
     [[nodiscard]] std::uint64_t generation() const { return generation_.load(std::memory_order_acquire); }
-    /// Removes what is stored for an identifier and for the children recorded for it. The caller holds the
-    /// all-identifiers lock, or knows why it need not.
-    void removeEntitlementDictionariesForIdentifierAndItsChildren(const std::string& identifier)
-        ZOR_EXCLUDES(entitlementQueue_);
-
-    /// A copy of the whole map.
-    [[nodiscard]] plist::Dictionary entitlementMappingDict() ZOR_EXCLUDES(entitlementQueue_);
 
     /// Stores a value under each key (an empty dictionary removes the key) and saves once, when anything changed. Error
     /// 60 when the counts differ, 59 when the save fails: the map in memory then keeps the change, and the next call
@@ -78,20 +97,19 @@ public:
     Result<void> _setEntitlementDictionaryValues(const std::vector<plist::Dictionary>& values,
                                                  const std::vector<std::string>& identifiers)
         ZOR_EXCLUDES(entitlementQueue_);
+    /// Unites what an older system kept with what is stored for an identifier: nothing of that goes. Error 59.
+    Result<void> uniteEntitlements(const std::string& identifier, const plist::Dictionary& older)
+        ZOR_EXCLUDES(entitlementQueue_);
 
-    // The first launch after a boot (FirstBootPasses.cc), before clients are served. Failures are logged and passed
-    // over. Both give the number of containers that they changed.
-    /// Moves the group identifiers that older systems kept in data containers into the map; once for the device.
-    std::uint64_t migrateAppGroupIdsFromDataContainersToFile() ZOR_EXCLUDES(entitlementQueue_);
-    /// Whether that has been done, at this boot at the latest, or there is nobody for whom it would have to be. As long
-    /// as not, groups may be in use that the map does not mention. Asked of the disk each time; enters no queue.
+    /// Whether the group identifiers that older systems kept in data containers are in the map, since this boot at the
+    /// latest, or there is nobody for whom they would have to be. As long as not, groups may be in use that the map
+    /// does not mention. Asked of the disk each time; enters no queue.
     [[nodiscard]] bool groupIdsAreMigrated();
-    /// Stages system containers that no identifier is entitled to for deletion.
-    std::uint64_t reconcileSystemContainers() ZOR_EXCLUDES(entitlementQueue_);
+    /// This process has done that migration, whether or not it could be marked as done.
+    void setGroupIdsMigrated(bool migrated) { groupIdsAreMigrated_ = migrated; }
 
     /// Where an entitlement file that could not be read lies, while it does. Asked of the disk each time.
     [[nodiscard]] std::optional<FileURL> lostFile();
-    [[nodiscard]] std::size_t entryCount() ZOR_EXCLUDES(entitlementQueue_);
 
 private:
     [[nodiscard]] plist::Dictionary _readEntitlementMappingFromDisk();
@@ -116,39 +134,19 @@ private:
     [[nodiscard]] Identifiers _onQueue_systemGroupIdentifiersForIdentifier(std::string_view identifier) const
         ZOR_REQUIRES(entitlementQueue_);
 
-    /// What a call of processEntitlements will store, in this order.
-    struct StagedChange {
-        std::vector<plist::Dictionary> values;
-        std::vector<std::string> keys;
-        /// The identifier's own entitlements are among it.
-        bool entitlementsChange = false;
-
-        [[nodiscard]] bool empty() const { return keys.empty(); }
-        void add(std::string_view key, plist::Dictionary value);
-    };
     enum class SayStaging { no, yes };
-
-    [[nodiscard]] StagedChange _onQueue_stage(const plist::Dictionary* entitlements, const std::string& identifier,
-                                              const plist::Dictionary* options, SayStaging say) const
-        ZOR_REQUIRES(entitlementQueue_);
-    void _onQueue_stageChildBundles(StagedChange& staged, const std::string& identifier,
-                                    const plist::Dictionary* options, SayStaging say) const
-        ZOR_REQUIRES(entitlementQueue_);
-    void _onQueue_stageFlag(StagedChange& staged, std::string_view key, const std::string& identifier,
+    /// The values of a plan. Whether the identifier's own entitlements are among them.
+    bool _onQueue_stage(Plan& plan, const plist::Dictionary* entitlements, const std::string& identifier,
+                        const plist::Dictionary* options, SayStaging say) const ZOR_REQUIRES(entitlementQueue_);
+    void _onQueue_stageChildBundles(Plan& plan, const std::string& identifier, const plist::Dictionary* options,
+                                    SayStaging say) const ZOR_REQUIRES(entitlementQueue_);
+    void _onQueue_stageFlag(Plan& plan, std::string_view key, const std::string& identifier,
                             const plist::Dictionary* options) const ZOR_REQUIRES(entitlementQueue_);
-    /// False, logged, on failure.
-    bool migrateGroupIdentifiers(const ZORMetadata& container) ZOR_EXCLUDES(entitlementQueue_);
-    /// nullopt, logged, when that cannot be known.
-    std::optional<std::set<std::string, std::less<>>> ownersOfSystemContainers() ZOR_EXCLUDES(entitlementQueue_);
-
-    ErrorCode _onQueue_processEntitlements(const plist::Dictionary* entitlements, const std::string& identifier,
-                                           const plist::Dictionary* options) ZOR_REQUIRES(entitlementQueue_);
-    Result<void> _onQueue_process(const plist::Dictionary* entitlements, const std::string& identifier,
-                                  const plist::Dictionary* options) ZOR_REQUIRES(entitlementQueue_);
-    void _onQueue_releaseSystemContainer(const plist::Dictionary* entitlements, const std::string& identifier)
+    /// What goes with the old entitlements.
+    void _onQueue_stageReleases(Plan& plan, const plist::Dictionary* entitlements, const std::string& identifier) const
         ZOR_REQUIRES(entitlementQueue_);
-    void _onQueue_releaseGroups(const plist::Dictionary* entitlements, const std::string& identifier)
-        ZOR_REQUIRES(entitlementQueue_);
+    [[nodiscard]] bool _onQueue_changesNothing(const plist::Dictionary* entitlements, const std::string& identifier,
+                                               const plist::Dictionary* options) const ZOR_REQUIRES(entitlementQueue_);
     Result<void> _onQueue_setEntitlementDictionaryValues(const std::vector<plist::Dictionary>& values,
                                                          const std::vector<std::string>& identifiers)
         ZOR_REQUIRES(entitlementQueue_);
@@ -156,12 +154,11 @@ private:
     const Log& log_;
     ZORFileManager& fileManager_;
     ZORGlobalConfiguration& configuration_;
-    StoreServices& services_;
+    MigrationMarkers& markers_;
     const FileURL entitlementMappingFileUrl_;
     const FileURL unreadableFileUrl_;
     /// The file that could not be read had its name still when that was last looked at. Set while the map is loaded.
     std::atomic<bool> fileIsUnread_{false};
-    /// This process has done the migration, whether or not it could be marked as done.
     std::atomic<bool> groupIdsAreMigrated_{false};
     /// Raised on the queue, before the map changes.
     std::atomic<std::uint64_t> generation_{1};

@@ -1,0 +1,93 @@
+// SPDX-License-Identifier: Apache-2.0
+// Every operation on the store, made once. A member may call those that stand above it, which it was given by
+// reference, and nothing else: the order of the members is the order of the house.
+//
+// Alive as long as the composition that made it. What is not an operation here is the data that several share.
+#pragma once
+
+#include "base/ZORException.h"
+#include "base/ZORLocks.h"
+#include "fs/Durability.h"
+#include "fs/ZORFileManager.h"
+#include "operations/ContainerMaker.h"
+#include "operations/ContainerRemoval.h"
+#include "operations/Creation.h"
+#include "operations/DeathRow.h"
+#include "operations/Deletion.h"
+#include "operations/DiskUsage.h"
+#include "operations/EntitlementChange.h"
+#include "operations/FirstBootPasses.h"
+#include "operations/InfoValues.h"
+#include "operations/LastingMoves.h"
+#include "operations/Listing.h"
+#include "operations/OrphanCleanUp.h"
+#include "operations/Replace.h"
+#include "operations/ReplaceRecovery.h"
+#include "operations/RetryTest.h"
+#include "operations/SandboxMappings.h"
+#include "operations/Setup.h"
+#include "operations/Structure.h"
+#include "operations/Wipe.h"
+#include "operations/ZORContainerMigrator.h"
+#include "operations/ZORDataProtectionManager.h"
+#include "operations/ZORGroupManager.h"
+#include "platform/Platform.h"
+#include "store/MigrationMarkers.h"
+#include "store/SetupReport.h"
+#include "store/StoreLimits.h"
+#include "store/ZORContainerCache.h"
+#include "store/ZOREntitlementMapping.h"
+#include "store/ZORGlobalConfiguration.h"
+#include "store/ZORWhitelist.h"
+
+namespace zor {
+
+struct Operations {
+    /// What lies below all of them.
+    struct Store {
+        const Log& log;
+        ExceptionBoundary& boundary;
+        ZORLocks& locks;
+        ZORFileManager& fileManager;
+        const fs::Durability& durability;
+        ZORGlobalConfiguration& configuration;
+        ZORContainerCache& cache;
+    };
+    /// Reads the entitlement file and the table of well-known containers.
+    Operations(const Store& store, const platform::Platform& platform);
+    Operations(const Operations&) = delete;
+    Operations& operator=(const Operations&) = delete;
+
+    ZORGlobalConfiguration& configuration;
+    const platform::InternalBuildQuery& internalBuild;
+    StoreLimits limits{};
+    SetupReport setup;
+    const ZORWhitelist whitelist;
+    MigrationMarkers markers;
+    ZOREntitlementMapping entitlements;
+
+    LastingMoves moves;
+    SandboxMappings mappings;
+    DeathRow deathRow;
+    ReplaceRecovery recovery;
+    ContainerMaker maker;
+    Creation creation;
+    ContainerRemoval removal;
+    ZORGroupManager groups;
+    EntitlementChange entitlementChange;
+    Deletion deletion;
+    Replace replace;
+    Wipe wipe;
+    InfoValues infoValues;
+    Structure structure;
+    DiskUsage diskUsage;
+    Listing listing;
+    RetryTest retryTest;
+    ZORDataProtectionManager dataProtection;
+    FirstBootPasses entitlementPasses;
+    ZORContainerMigrator migrator;
+    OrphanCleanUp orphans;
+    Setup settingUp;
+};
+
+} // namespace zor

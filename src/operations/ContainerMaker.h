@@ -1,0 +1,66 @@
+// SPDX-License-Identifier: Apache-2.0
+// Builds one container in the staging directory, complete, and moves it into its class directory with one move.
+//
+// Everything is made as the daemon's own, closed to others, and given its mode and owner in a last pass, from the
+// deepest directory up: at no moment can the future owner, or anybody whom a mode lets in, reach a directory that the
+// daemon still works in. What is made is worked on through descriptors.
+//
+// Unlike a directory getter, a container is not there by halves: a mode or an owner that cannot be set fails the build.
+//
+// What a stop leaves: while it is built, a directory in staging, which the next launch moves to death row; after the
+// move into the class directory, the container, whole. What a power cut leaves is the same: the metadata file's data is
+// on the disk before the move can be (fs/Durability.h).
+#pragma once
+
+#include "base/ContainerClass.h"
+#include "base/Result.h"
+#include "fs/Durability.h"
+#include "fs/ZORFileManager.h"
+#include "operations/DeathRow.h"
+#include "store/ZORGlobalConfiguration.h"
+#include "store/ZORMetadata.h"
+#include "store/ZORWhitelist.h"
+
+#include <cstdint>
+#include <memory>
+#include <string>
+
+namespace zor {
+
+class ContainerMaker {
+public:
+    struct Needs {
+        const Log& log;
+        ZORFileManager& fileManager;
+        const fs::Durability& durability;
+        ZORGlobalConfiguration& configuration;
+        const ZORWhitelist& whitelist;
+        DeathRow& deathRow;
+    };
+    explicit ContainerMaker(const Needs& needs) : needs_(needs) {}
+
+    struct Wanted {
+        std::uint32_t userId;
+        const std::string& identifier;
+        ContainerClass containerClass;
+        bool transient;
+        /// Of the home in which the container was looked for and not found.
+        std::uint64_t homeGeneration;
+    };
+    struct Made {
+        /// Its place is still the one in staging, and it is not durable.
+        std::shared_ptr<ZORMetadata> record;
+        FileURL live;
+    };
+    /// Errors 6, 7, 8, 34; or 9 when what was begun could not be moved away.
+    Result<Made> make(const Wanted& wanted);
+
+private:
+    Result<void> build(const ZORMetadata& record, const FileURL& staging);
+    Result<FileURL> moveIntoPlace(const Wanted& wanted, const FileURL& staging);
+    ZORError cleanUpStaging(const FileURL& staging, ZORError error);
+
+    const Needs needs_;
+};
+
+} // namespace zor

@@ -1,0 +1,108 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "operations/ContainerRemoval.h"
+
+#include "store/ContainerLayout.h"
+
+#include <cerrno>
+#include <utility>
+
+namespace zor {
+
+namespace {
+
+constexpr const char* function = "stageForDeleteContainersWithUsers";
+
+} // namespace
+
+Result<void> ContainerRemoval::stage(const ContainerToGo& container) {
+    return needs_.boundary.run({function, __LINE__}, [&]() -> Result<void> {
+        std::vector<FileURL> changed;
+        auto staged = [&] {
+            const AllIdentifiersWriteLock lock(needs_.locks);
+            return findAndTake(container, changed, lock);
+        }();
+        return conclude(std::move(staged), std::move(changed));
+    });
+}
+
+Result<void> ContainerRemoval::stage(const ContainerToGo& container, const AllIdentifiersWriteLock& lock) {
+    return needs_.boundary.run({function, __LINE__}, [&]() -> Result<void> {
+        std::vector<FileURL> changed;
+        auto staged = findAndTake(container, changed, lock);
+        return conclude(std::move(staged), std::move(changed));
+    });
+}
+
+Result<void> ContainerRemoval::findAndTake(const ContainerToGo& container, std::vector<FileURL>& changed,
+                                           const AllIdentifiersWriteLock& lock) {
+    const auto record = TRY(find(container, lock));
+    return record ? take(container, *record, changed, lock) : Result<void>();
+}
+
+Result<std::shared_ptr<ZORMetadata>> ContainerRemoval::find(const ContainerToGo& container,
+                                                            const AllIdentifiersWriteLock& lock) {
+    // A container that waits to come back is not given the place of this one.
+    return needs_.recovery.settledContainer(container.userId, container.containerClass, &container.identifier,
+                                            container.uuid, lock);
+}
+
+Result<void> ContainerRemoval::take(const ContainerToGo& container, const ZORMetadata& record,
+                                    std::vector<FileURL>& changed, const AllIdentifiersWriteLock& /*held*/) {
+    const auto& [userId, uuid, identifier, containerClass] = container;
+    const bool transient = record.transient();
+    if (!takeAway(record.url(), topLevelOwnerOf(record.containerClass(), record.uid()), changed))
+        return {};
+    if (isPerUserClass(containerClass) && !transient &&
+        !needs_.mappings._setSandboxContainerMappingForUser(userId, identifier, containerClass, std::nullopt))
+        needs_.log.write(logLevelError, function, "Failed to remove container mapping in delete operation");
+    const auto removed =
+        needs_.cache.removeContainerForUser(userId, record.containerClass(), &record.identifier(), transient);
+    if (!removed)
+        return makeError(needs_.log, {function, __LINE__}, ErrorCode::cacheRemoveFailed, &removed.error(), LogFlag::yes,
+                         "Failed to remove from cache id: %s, class: %ld, transient: %d", ZOR_SHOWN(identifier),
+                         static_cast<long>(containerClass), transient);
+    return {};
+}
+
+Result<void> ContainerRemoval::conclude(Result<void> staged, std::vector<FileURL> changed) {
+    // Those staged before a failure are gone for good too.
+    const auto failed = needs_.moves.syncDirectories(std::move(changed));
+    if (!staged || !failed)
+        return staged;
+    return makeError(needs_.log, {function, __LINE__}, ErrorCode::listForDeletionFailed, &*failed, LogFlag::yes,
+                     "Failed to make deletions durable: %s", failed->text().c_str());
+}
+
+bool ContainerRemoval::takeAway(const FileURL& container, std::optional<std::uint32_t> owner,
+                                std::vector<FileURL>& changed) {
+    const FileURL deathRow = needs_.configuration.deathrowDirectory();
+    const FileURL destination = deathRow.appendingDirectory(container.lastPathComponent());
+    const auto moved = needs_.deathRow.condemn(container, destination, owner);
+    if (moved) {
+        // On its own file system the move is on the disk with the directory that it left.
+        changed.push_back(*moved == DeathRow::Row::ofRoot ? deathRow : container.deletingLastPathComponent());
+        return true;
+    }
+    ZOR_LOG(needs_.log, logLevelDebug, "Couldn't stage for deletion from %s to %s: %s", container.c_str(),
+            destination.c_str(), moved.error().text().c_str());
+    // An earlier container of a well-known name may still wait on death row under that name. This one goes beside it: a
+    // stop while it is removed in place would leave half of it under the name it has.
+    const bool nameIsTaken = moved.error().isPosix(ENOTEMPTY) || moved.error().isPosix(EEXIST);
+    if (nameIsTaken && needs_.deathRow._moveItemAtURLToDeathRow(container, StartDeletionThread::no, owner)) {
+        changed.push_back(deathRow);
+        return true;
+    }
+    // What stopped the move would stop the removal too, half-way; and another's directory is not ours to remove. Then
+    // it stays whole.
+    const bool stays = moved.error().isOwnShortage() || moved.error().isPosix(DeathRow::notTheContainer);
+    const auto removed = stays ? Result<void>(moved.error()) : needs_.fileManager.removeItemAtURL(container);
+    if (!removed) {
+        makeError(needs_.log, {function, __LINE__}, ErrorCode::listForDeletionFailed, &removed.error(), LogFlag::yes,
+                  "Failed to delete container at %s: %s", container.c_str(), removed.error().text().c_str());
+        return false;
+    }
+    changed.push_back(container.deletingLastPathComponent());
+    return true;
+}
+
+} // namespace zor

@@ -1,0 +1,77 @@
+// SPDX-License-Identifier: Apache-2.0
+// One container leaves the store: it moves to death row, its mapping and its record go. Nothing is asked of what it was
+// registered for; that is the matter of who calls (Deletion, EntitlementChange, ZORGroupManager).
+//
+// What a stop leaves after the move: a mapping that points to nothing, which the next launch removes; the cache ends
+// with the process. Moves are on the disk before the caller hears of them. Any thread.
+#pragma once
+
+#include "base/ContainerClass.h"
+#include "base/FileURL.h"
+#include "base/Result.h"
+#include "base/UUID.h"
+#include "base/ZORException.h"
+#include "base/ZORLocks.h"
+#include "operations/DeathRow.h"
+#include "operations/LastingMoves.h"
+#include "operations/ReplaceRecovery.h"
+#include "operations/SandboxMappings.h"
+#include "store/ZORContainerCache.h"
+#include "store/ZORGlobalConfiguration.h"
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace zor {
+
+/// Which container is to go.
+struct ContainerToGo {
+    std::uint32_t userId;
+    UUID uuid;
+    const std::string& identifier;
+    ContainerClass containerClass;
+};
+
+class ContainerRemoval {
+public:
+    struct Needs {
+        const Log& log;
+        ExceptionBoundary& boundary;
+        ZORLocks& locks;
+        ZORFileManager& fileManager;
+        ZORGlobalConfiguration& configuration;
+        ZORContainerCache& cache;
+        const LastingMoves& moves;
+        SandboxMappings& mappings;
+        DeathRow& deathRow;
+        ReplaceRecovery& recovery;
+    };
+    explicit ContainerRemoval(const Needs& needs) : needs_(needs) {}
+
+    /// Stages one container for deletion; one that is not there is skipped. Errors 28 (not durable), 35 (another may
+    /// come back in its place), 44 (it could not be looked for), 46, 40.
+    Result<void> stage(const ContainerToGo& container);
+    Result<void> stage(const ContainerToGo& container, const AllIdentifiersWriteLock& lock);
+
+    // The steps of it, for who stages several.
+    /// The record; nullptr when there is none.
+    Result<std::shared_ptr<ZORMetadata>> find(const ContainerToGo& container, const AllIdentifiersWriteLock& lock);
+    /// `changed` gets the directories to be synced.
+    Result<void> take(const ContainerToGo& container, const ZORMetadata& record, std::vector<FileURL>& changed,
+                      const AllIdentifiersWriteLock& lock);
+    /// What has been taken is on the disk, whatever `staged` says of the rest. Without a lock where that can be.
+    Result<void> conclude(Result<void> staged, std::vector<FileURL> changed);
+
+private:
+    Result<void> findAndTake(const ContainerToGo& container, std::vector<FileURL>& changed,
+                             const AllIdentifiersWriteLock& lock);
+    /// False, logged, when the container stays where it is. `owner` as DeathRow::condemn has it.
+    bool takeAway(const FileURL& container, std::optional<std::uint32_t> owner, std::vector<FileURL>& changed);
+
+    const Needs needs_;
+};
+
+} // namespace zor

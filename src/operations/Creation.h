@@ -1,0 +1,99 @@
+// SPDX-License-Identifier: Apache-2.0
+// Finding a container, and making it where it is missing.
+//
+// Creation.cc says who may have which container and which record answers; ContainerMaker puts a new one on the disk and
+// says what a stop leaves. The sync after the move runs when the all-identifiers lock is released, so those of
+// concurrent creators share the disk's commit. Until it is done the record says so, and whoever finds it meanwhile
+// waits for a sync of its own before it answers. Any thread.
+#pragma once
+
+#include "base/ContainerClass.h"
+#include "base/Result.h"
+#include "base/UUID.h"
+#include "base/ZORException.h"
+#include "base/ZORLocks.h"
+#include "operations/Caller.h"
+#include "operations/ContainerMaker.h"
+#include "operations/DeathRow.h"
+#include "operations/LastingMoves.h"
+#include "operations/ReplaceRecovery.h"
+#include "store/StoreLimits.h"
+#include "store/ZORContainerCache.h"
+#include "store/ZOREntitlementMapping.h"
+#include "store/ZORGlobalConfiguration.h"
+
+#include <cstdint>
+#include <memory>
+#include <string>
+
+namespace zor {
+
+/// A container as an operation found or made it. What a reply needs of the record was read while the operation still
+/// held its lock, so one client never sees what another's request made of the shared record meanwhile.
+struct FoundContainer {
+    std::shared_ptr<ZORMetadata> record;
+    UUID uuid;
+    std::string path;
+    bool existed = false;
+};
+
+struct CreateOrLookupOptions {
+    bool createIfNecessary = false;
+    bool transient = false;
+    /// It is made to take the place of another of the user's, so the user's share does not count.
+    bool replacesAnother = false;
+};
+
+class Creation {
+public:
+    struct Needs {
+        const Log& log;
+        ExceptionBoundary& boundary;
+        ZORLocks& locks;
+        ZORGlobalConfiguration& configuration;
+        ZORContainerCache& cache;
+        ZOREntitlementMapping& entitlements;
+        const StoreLimits& limits;
+        const LastingMoves& moves;
+        DeathRow& deathRow;
+        ReplaceRecovery& recovery;
+        ContainerMaker& maker;
+    };
+    explicit Creation(const Needs& needs) : needs_(needs) {}
+
+    /// The container of (user, identifier, class), created if asked, and on the disk; error 38 where its user has as
+    /// many as one may have and the caller does not own the root. Runs under the all-identifiers lock held for writing,
+    /// where a live container is not simply found (UndisturbedLookup.h). `identifier` nullptr: error 11.
+    Result<FoundContainer> createOrLookupContainerForUser(const Caller& caller, std::uint32_t userId,
+                                                          const std::string* identifier, ContainerClass containerClass,
+                                                          const CreateOrLookupOptions& options);
+    /// The same for who holds that lock; makeDurable is called on the result when the lock is released, before anybody
+    /// is told.
+    Result<FoundContainer> createOrLookupContainerForUser(const Caller& caller, std::uint32_t userId,
+                                                          const std::string* identifier, ContainerClass containerClass,
+                                                          const CreateOrLookupOptions& options,
+                                                          const AllIdentifiersWriteLock& lock);
+    /// Returns at once for a container whose place is on the disk already. Error 8.
+    Result<void> makeDurable(const FoundContainer& container);
+
+private:
+    struct Wanted {
+        const Caller& caller;
+        std::uint32_t userId;
+        const std::string& identifier;
+        ContainerClass containerClass;
+        const CreateOrLookupOptions& options;
+    };
+    Result<void> checkRequest(const Caller& caller, std::uint32_t userId, const std::string* identifier,
+                              ContainerClass containerClass);
+    Result<FoundContainer> createOrLookup(const Wanted& wanted, const AllIdentifiersWriteLock& lock);
+    /// Error 38 when the user of the container has as many as one may have.
+    Result<void> checkShare(const Wanted& wanted);
+    Result<void> discardTransient(const ZORMetadata& record, const std::string& identifier);
+    /// `homeGeneration`: of the home in which the container was looked for and not found.
+    Result<FoundContainer> create(const Wanted& wanted, std::uint64_t homeGeneration);
+
+    const Needs needs_;
+};
+
+} // namespace zor

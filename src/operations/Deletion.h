@@ -1,0 +1,70 @@
+// SPDX-License-Identifier: Apache-2.0
+// Taking containers out of the store at a client's word: a whole batch, or the one of an identifier.
+//
+// A container leaves with one move to death row (ContainerRemoval); the slow removal comes with a later pass. A live
+// bundle takes along what is registered for it (EntitlementChange), first. What a stop leaves after that: the bundle
+// still there; deleting it again finds nothing more to drop. Elements of a batch are independent: a stop in the middle
+// has staged the first ones. Any thread.
+#pragma once
+
+#include "base/ContainerClass.h"
+#include "base/Result.h"
+#include "base/UUID.h"
+#include "base/ZORException.h"
+#include "base/ZORLocks.h"
+#include "operations/Caller.h"
+#include "operations/ContainerRemoval.h"
+#include "operations/Creation.h"
+#include "operations/EntitlementChange.h"
+
+#include <cstdint>
+#include <expected>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace zor {
+
+/// Parallel lists; element i of each describes one container. An element that a client gave with another type is
+/// absent.
+struct DeletionBatch {
+    std::vector<std::uint32_t> users;
+    std::vector<std::optional<UUID>> uuids;
+    std::vector<std::optional<std::string>> identifiers;
+    /// A class number, or how an element that is no number reads.
+    std::vector<std::expected<std::uint64_t, std::string>> classes;
+
+    static DeletionBatch of(std::uint32_t userId, const UUID& uuid, const std::string& identifier,
+                            ContainerClass containerClass);
+};
+
+class Deletion {
+public:
+    struct Needs {
+        const Log& log;
+        ExceptionBoundary& boundary;
+        ZORLocks& locks;
+        Creation& creation;
+        ContainerRemoval& removal;
+        EntitlementChange& entitlementChange;
+    };
+    explicit Deletion(const Needs& needs) : needs_(needs) {}
+
+    /// Takes the containers out of the store; their files go with the next deletion pass. What is not there is skipped,
+    /// what is malformed is logged and skipped. Runs under the all-identifiers lock held for writing. Only a live
+    /// bundle's deletion releases what is registered for it. Errors 11 (lists that do not agree), and those of
+    /// ContainerRemoval.
+    Result<void> stageForDeleteContainersWithUsers(const DeletionBatch& batch);
+    /// Stages the one container of an identifier. Errors as the lookup's and the staging's.
+    Result<void> deleteContainerForUser(const Caller& caller, std::uint32_t userId, const std::string* identifier,
+                                        ContainerClass containerClass, bool transient);
+
+private:
+    /// One element; `changed` gets the directories to be synced.
+    Result<void> stageForDelete(const DeletionBatch& batch, std::size_t index, std::vector<FileURL>& changed,
+                                const AllIdentifiersWriteLock& lock);
+
+    const Needs needs_;
+};
+
+} // namespace zor

@@ -1,0 +1,65 @@
+// SPDX-License-Identifier: Apache-2.0
+// How many bytes a container takes. What a live bundle takes is measured once and kept with its info, since its content
+// does not change; everything else is measured each time. A transient bundle is being filled.
+//
+// A bundle that is being filled is measured too, but not kept: nothing of what was walked may have changed within
+// settledTime before the walk, or in it. What is not seen: a fill that pauses for longer than that, and one that begins
+// during the walk in what was walked before, below the container's own directory.
+//
+// The walk holds no lock: a lookup waits for every identifier lock, so a large container would stop all clients for as
+// long as it is walked. The container is looked up and opened under its lock, and walked on that descriptor; the result
+// is kept only if the lock, taken again, finds the same container at the same place. Any thread.
+#pragma once
+
+#include "base/ErrorCode.h"
+#include "base/Result.h"
+#include "base/ZORException.h"
+#include "base/ZORLocks.h"
+#include "fs/ZORFileManager.h"
+#include "operations/Caller.h"
+#include "operations/InfoValues.h"
+#include "operations/KnownContainer.h"
+#include "store/ZORContainerCache.h"
+
+#include <chrono>
+#include <cstdint>
+#include <optional>
+
+namespace zor {
+
+/// `error` is the code.
+struct DiskUsageAnswer {
+    std::uint64_t bytes = 0;
+    ErrorCode error = ErrorCode::success;
+};
+
+class DiskUsage {
+public:
+    struct Needs {
+        const Log& log;
+        ExceptionBoundary& boundary;
+        ZORLocks& locks;
+        ZORFileManager& fileManager;
+        ZORContainerCache& cache;
+        InfoValues& infoValues;
+    };
+    explicit DiskUsage(const Needs& needs) : needs_(needs) {}
+
+    /// Allocated bytes; of bundles measured once. Errors 11, 21, 38, 40.
+    DiskUsageAnswer diskUsageForUserId(const Caller& caller, const ContainerAddress& address);
+
+    /// A bundle in which nothing has changed for so long counts as filled: longer than an installation pauses, less
+    /// than somebody waits for a second look. Tests make it shorter, before the first question.
+    std::chrono::milliseconds settledTime{10'000};
+
+private:
+    Result<std::uint64_t> diskUsage(const Caller& caller, const ContainerAddress& address);
+    /// What an earlier measurement left.
+    std::optional<std::uint64_t> keptDiskUsage(const ContainerAddress& address, const IdentifierLock& held);
+    void keepDiskUsage(const Caller& caller, const ContainerAddress& address, const FileURL& measured,
+                       std::uint64_t bytes);
+
+    const Needs needs_;
+};
+
+} // namespace zor

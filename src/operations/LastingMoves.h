@@ -1,0 +1,39 @@
+// SPDX-License-Identifier: Apache-2.0
+// What an operation that moved containers does before it answers: the moves are to be on the disk.
+//
+// Syncs run without locks wherever that can be. One that fails leaves what was moved in its new place, and the answer
+// says that a power cut may undo it. Any thread.
+#pragma once
+
+#include "base/FileURL.h"
+#include "base/Result.h"
+#include "fs/Durability.h"
+#include "fs/ZORFileManager.h"
+
+#include <optional>
+#include <vector>
+
+namespace zor {
+
+class LastingMoves {
+public:
+    LastingMoves(const Log& log, const ZORFileManager& fileManager, const fs::Durability& durability)
+        : log_(log), fileManager_(fileManager), durability_(durability) {}
+
+    [[nodiscard]] const fs::Durability& durability() const { return durability_; }
+
+    /// Makes what was moved into or out of these directories durable; the error is not logged.
+    [[nodiscard]] std::optional<ZORError> syncDirectories(std::vector<FileURL> changed) const;
+    /// What was changed in one directory is on the disk before what comes in the other can be. 0 or a negative errno.
+    [[nodiscard]] int orderBetween(const FileURL& changed, const FileURL& next) const;
+    /// The error of a container whose move into its place could not be synced, logged. The record says so until one is.
+    [[nodiscard]] ZORError notLasting(const char* function, ErrorCode code, const FileURL& container,
+                                      const ZORError& cause) const;
+
+private:
+    const Log& log_;
+    const ZORFileManager& fileManager_;
+    const fs::Durability& durability_;
+};
+
+} // namespace zor

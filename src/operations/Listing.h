@@ -1,0 +1,56 @@
+// SPDX-License-Identifier: Apache-2.0
+// Listing the containers of a class. Changes nothing. Any thread; under the all-identifiers lock held for reading.
+#pragma once
+
+#include "base/ContainerClass.h"
+#include "base/Result.h"
+#include "base/UUID.h"
+#include "base/ZORException.h"
+#include "base/ZORLocks.h"
+#include "store/StoreLimits.h"
+#include "store/ZORContainerCache.h"
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace zor {
+
+struct ListedContainer {
+    std::string identifier;
+    UUID uuid;
+};
+
+struct ListedPage {
+    std::vector<ListedContainer> containers;
+    /// The `after` of the next page; absent when there is none.
+    std::optional<std::string> next;
+};
+
+class Listing {
+public:
+    struct Needs {
+        const Log& log;
+        ExceptionBoundary& boundary;
+        ZORLocks& locks;
+        ZORContainerCache& cache;
+        const StoreLimits& limits;
+    };
+    explicit Listing(const Needs& needs) : needs_(needs) {}
+
+    /// Errors 11, 40, 45.
+    Result<std::vector<ListedContainer>> containersForUser(std::uint32_t userId, ContainerClass containerClass,
+                                                           bool transient);
+    /// The same, limits.listPageMax at a time, in the order of the identifiers' bytes: those behind `after`, which is
+    /// empty for the first page. What is made or goes between two pages may be listed or not; all else is, once.
+    Result<ListedPage> containersForUser(std::uint32_t userId, ContainerClass containerClass, bool transient,
+                                         const std::string& after);
+
+private:
+    Result<void> checkListedClass(std::uint32_t userId, ContainerClass containerClass);
+
+    const Needs needs_;
+};
+
+} // namespace zor

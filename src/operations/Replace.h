@@ -1,0 +1,100 @@
+// SPDX-License-Identifier: Apache-2.0
+// Putting a new container in the place of an old one.
+//
+// The one change of the store that takes more than one move, so it has a journal; ReplaceRecovery reads it. In order:
+//   1. the new one's file gets the old UUID, where that is preserved   stopped: a transient one is discarded
+//   2. the journal is written                                          stopped: half a file goes; nothing has happened
+//   3. the old one moves to staging                                    stopped: it moves back; nothing has happened
+//   4. the new one moves to its destination                            stopped: done; staging is swept
+//   5. what waits in staging goes to death row, then the journal       stopped: done; the journal goes
+//
+// A power cut leaves the same states: the journal is synced before the first move, the moves keep their order (where
+// the file system does not see to that, syncs do), and they are on the disk before the journal goes and the client
+// hears.
+//
+// A sync that fails behind the first move undoes it; one that fails behind the second leaves the journal, and what
+// waits in staging, to ReplaceRecovery: from there the old one never goes to death row before the moves are on the
+// disk.
+//
+// A replace whose second move fails has lost the old container, which went to death row. So everything that can be
+// looked at beforehand is: both directories can be opened, the destination is free.
+//
+// Any thread.
+#pragma once
+
+#include "base/ContainerClass.h"
+#include "base/Result.h"
+#include "base/UUID.h"
+#include "base/ZORException.h"
+#include "base/ZORLocks.h"
+#include "operations/DeathRow.h"
+#include "operations/LastingMoves.h"
+#include "operations/ReplaceRecovery.h"
+#include "operations/SandboxMappings.h"
+#include "store/ZORContainerCache.h"
+#include "store/ZORGlobalConfiguration.h"
+#include "store/ZORWhitelist.h"
+
+#include <cstdint>
+#include <optional>
+#include <string>
+
+namespace zor {
+
+enum class PreserveOldUUID { no, yes };
+
+struct ReplaceRequest {
+    std::optional<UUID> oldUuid; // absent: the new container becomes the live one of its identifier
+    std::optional<UUID> newUuid;
+    std::uint32_t userIdOld = 0;
+    std::uint32_t userIdNew = 0;
+    std::optional<std::string> identifierOld;
+    std::optional<std::string> identifierNew;
+    ContainerClass classOld = ContainerClass::undefined;
+    ContainerClass classNew = ContainerClass::undefined;
+    PreserveOldUUID preserveOldUuid = PreserveOldUUID::no;
+};
+
+class Replace {
+public:
+    struct Needs {
+        const Log& log;
+        ExceptionBoundary& boundary;
+        ZORLocks& locks;
+        ZORFileManager& fileManager;
+        ZORGlobalConfiguration& configuration;
+        ZORContainerCache& cache;
+        const ZORWhitelist& whitelist;
+        const LastingMoves& moves;
+        SandboxMappings& mappings;
+        DeathRow& deathRow;
+        ReplaceRecovery& recovery;
+    };
+    explicit Replace(const Needs& needs) : needs_(needs) {}
+
+    /// Puts the new container in the place of the old one, under the all-identifiers lock held for writing. Errors 10,
+    /// 11, 14, 15, 21 to 23, 27, 33 to 36, 40, 45, 46, 56. From error 15 on the old container is gone: it waits on
+    /// death row. With error 35 it waits in staging for the next request that asks for it, or the next launch.
+    Result<void> replaceContainer(const ReplaceRequest& request, StartDeletionThread startDeletionThread);
+
+private:
+    struct Progress;
+
+    Result<void> checkReplace(const ReplaceRequest& request);
+    Result<void> checkedReplace(const ReplaceRequest& request, StartDeletionThread startDeletionThread);
+    Result<void> swapContainers(const ReplaceRequest& request, Progress& progress, const AllIdentifiersWriteLock& lock);
+    Result<void> prepareReplace(const ReplaceRequest& request, Progress& progress, const AllIdentifiersWriteLock& lock);
+    Result<void> refuseSecondOfIdentifier(const Progress& progress);
+    Result<void> moveOldAway(const ReplaceRequest& request, Progress& progress);
+    Result<void> putNewInPlace(const ReplaceRequest& request, Progress& progress);
+    Result<void> openDirectories(Progress& progress, const FileURL& stagingUrl);
+    /// Error 14, or 35 when the old one waits in staging.
+    ZORError undoFirstMove(Progress& progress, const ZORError& cause);
+    void recoverFromException(const Progress& progress);
+    std::optional<ZORError> cleanUpReplace(Progress& progress, StartDeletionThread startDeletionThread);
+    ZORError notInPlace(const Progress& progress, const ZORError& cause);
+
+    const Needs needs_;
+};
+
+} // namespace zor
