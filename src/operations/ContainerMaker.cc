@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "operations/ContainerMaker.h"
 
+#include "base/BlockingScope.h"
 #include "fs/AtomicFile.h"
 #include "fs/DictionaryFile.h"
 #include "os/FileDescriptor.h"
@@ -12,6 +13,7 @@
 #include <cerrno>
 #include <cstring>
 #include <fcntl.h>
+#include <new>
 #include <string_view>
 #include <utility>
 #include <vector>
@@ -165,47 +167,70 @@ Result<void> ContainerBuilder::orderBeforeMove(const fs::Durability& durability)
 
 } // namespace
 
-Result<ContainerMaker::Made> ContainerMaker::make(const Wanted& wanted) {
-    const FileURL staging = needs_.configuration.stagingDirectory().appendingDirectory(UUID::random().string());
-    const auto record = std::make_shared<ZORMetadata>(wanted.userId, UUID::random(), wanted.containerClass,
-                                                      wanted.identifier, nullptr, ContainerPlace(staging));
-    record->setDurable(false);
+template <typename Step>
+auto ContainerMaker::orCleanUp(const FileURL& staging, Step&& step) -> decltype(step()) {
     try {
-        if (auto built = build(*record, staging); !built)
-            return cleanUpStaging(staging, std::move(built).error());
-        auto live = moveIntoPlace(wanted, staging);
-        if (!live)
-            return cleanUpStaging(staging, std::move(live).error());
-        return Made{.record = record, .live = std::move(*live)};
+        auto result = step();
+        if (result)
+            return result;
+        const auto moved = needs_.deathRow._moveItemAtURLToDeathRow(staging, StartDeletionThread::yes);
+        if (moved)
+            return result;
+        return makeError(needs_.log, {function, __LINE__}, ErrorCode::stagingRemovalFailed, &moved.error(),
+                         LogFlag::yes, "Failed to remove staging dir: %s", staging.c_str());
     } catch (...) {
         (void)needs_.deathRow._moveItemAtURLToDeathRow(staging, StartDeletionThread::yes);
         throw;
     }
 }
 
-Result<void> ContainerMaker::build(const ZORMetadata& record, const FileURL& staging) {
+Result<ContainerMaker::Built> ContainerMaker::build(std::uint32_t userId, const std::string& identifier,
+                                                    ContainerClass containerClass) {
+    FileURL staging = needs_.configuration.stagingDirectory().appendingDirectory(UUID::random().string());
+    auto record = std::make_shared<ZORMetadata>(userId, UUID::random(), containerClass, identifier, nullptr,
+                                                ContainerPlace(staging));
+    record->setDurable(false);
+    TRY(orCleanUp(staging, [&] { return buildIn(staging, *record); }));
+    return Built{.record = std::move(record), .staging = std::move(staging)};
+}
+
+Result<FileURL> ContainerMaker::putInPlace(const Built& built, bool transient, std::uint64_t homeGeneration) {
+    return orCleanUp(built.staging, [&] { return moveIntoPlace(built, transient, homeGeneration); });
+}
+
+void ContainerMaker::discard(const Built& built) noexcept {
+    try {
+        (void)needs_.deathRow._moveItemAtURLToDeathRow(built.staging, StartDeletionThread::yes);
+    } catch (const std::bad_alloc&) {
+        // The next launch sweeps staging.
+    }
+}
+
+Result<void> ContainerMaker::buildIn(const FileURL& staging, const ZORMetadata& record) {
     ContainerBuilder builder(needs_.log, needs_.fileManager, staging, layoutOf(record.containerClass(), record.uid()));
     TRY(builder._createTopLevelContainerDirectory());
     TRY(builder._createSubDirectories());
     TRY(builder.writeMetadata(record));
     TRY(builder.giveAway());
+    const platform::BlockingScope blocking; // the disk must not take one of the few threads from all clients
     return builder.orderBeforeMove(needs_.durability);
 }
 
-Result<FileURL> ContainerMaker::moveIntoPlace(const Wanted& wanted, const FileURL& staging) {
+Result<FileURL> ContainerMaker::moveIntoPlace(const Built& built, bool transient, std::uint64_t homeGeneration) {
+    const FileURL& staging = built.staging;
+    const std::uint32_t userId = built.record->uid();
+    const ContainerClass containerClass = built.record->containerClass();
     constexpr Here here{function, __LINE__};
     // The fixed name is the live one's; a transient one has a name with which it can take its place.
     const std::string* wellKnown =
-        wanted.transient ? nullptr : needs_.whitelist.wellknownContainerForId(wanted.identifier, wanted.containerClass);
+        transient ? nullptr : needs_.whitelist.wellknownContainerForId(built.record->identifier(), containerClass);
     FileURL live;
     const auto moved = [&]() -> Result<void> {
-        const auto classDirectory =
-            needs_.configuration.openClassDirectory(wanted.userId, wanted.containerClass, wanted.transient);
+        const auto classDirectory = needs_.configuration.openClassDirectory(userId, containerClass, transient);
         // A container that was looked for in one home is not made in another.
-        const UserHome* const home =
-            isPerUserClass(wanted.containerClass) ? needs_.configuration.homeOf(wanted.userId) : nullptr;
-        if (!classDirectory || (home && home->generation() != wanted.homeGeneration))
-            return posixError(here, ENOENT, "the home of user %u is not there, or has just changed", wanted.userId);
+        const UserHome* const home = isPerUserClass(containerClass) ? needs_.configuration.homeOf(userId) : nullptr;
+        if (!classDirectory || (home && home->generation() != homeGeneration))
+            return posixError(here, ENOENT, "the home of user %u is not there, or has just changed", userId);
         live = classDirectory->url.appendingDirectory(wellKnown ? std::string_view(*wellKnown)
                                                                 : staging.lastPathComponent());
         const auto from = needs_.fileManager.resolver().openParent(staging);
@@ -221,14 +246,6 @@ Result<FileURL> ContainerMaker::moveIntoPlace(const Wanted& wanted, const FileUR
         return makeError(needs_.log, here, ErrorCode::moveToLiveFailed, &moved.error(), LogFlag::yes,
                          "Failed to move staging dir: %s to live dir: %s", staging.c_str(), live.c_str());
     return live;
-}
-
-ZORError ContainerMaker::cleanUpStaging(const FileURL& staging, ZORError error) {
-    const auto moved = needs_.deathRow._moveItemAtURLToDeathRow(staging, StartDeletionThread::yes);
-    if (moved)
-        return error;
-    return makeError(needs_.log, {function, __LINE__}, ErrorCode::stagingRemovalFailed, &moved.error(), LogFlag::yes,
-                     "Failed to remove staging dir: %s", staging.c_str());
 }
 
 } // namespace zor

@@ -39,26 +39,27 @@ public:
     };
     explicit ContainerMaker(const Needs& needs) : needs_(needs) {}
 
-    struct Wanted {
-        std::uint32_t userId;
-        const std::string& identifier;
-        ContainerClass containerClass;
-        bool transient;
-        /// Of the home in which the container was looked for and not found.
-        std::uint64_t homeGeneration;
-    };
-    struct Made {
-        /// Its place is still the one in staging, and it is not durable.
+    /// A container in staging: whole, and on the disk before any move of it can be.
+    struct Built {
+        /// Its place is the one in staging, and it is not durable.
         std::shared_ptr<ZORMetadata> record;
-        FileURL live;
+        FileURL staging;
     };
-    /// Errors 6, 7, 8, 34; or 9 when what was begun could not be moved away.
-    Result<Made> make(const Wanted& wanted);
+    /// Needs no lock, and is dear: the disk is waited for. Errors 6, 7, 34; or 9 when what was begun could not be moved
+    /// away.
+    Result<Built> build(std::uint32_t userId, const std::string& identifier, ContainerClass containerClass);
+    /// Moves it into its class directory, and gives its place there. `homeGeneration`: of the home in which the
+    /// container was looked for and not found. Error 8; or 9 as above: it is not in staging any more, whatever happens.
+    Result<FileURL> putInPlace(const Built& built, bool transient, std::uint64_t homeGeneration);
+    /// Moves one away that is not needed. One that cannot be moved is swept from staging at the next launch.
+    void discard(const Built& built) noexcept;
 
 private:
-    Result<void> build(const ZORMetadata& record, const FileURL& staging);
-    Result<FileURL> moveIntoPlace(const Wanted& wanted, const FileURL& staging);
-    ZORError cleanUpStaging(const FileURL& staging, ZORError error);
+    Result<void> buildIn(const FileURL& staging, const ZORMetadata& record);
+    Result<FileURL> moveIntoPlace(const Built& built, bool transient, std::uint64_t homeGeneration);
+    /// The value of `step`; when that fails or throws, what is in staging is moved away first.
+    template <typename Step>
+    auto orCleanUp(const FileURL& staging, Step&& step) -> decltype(step());
 
     const Needs needs_;
 };

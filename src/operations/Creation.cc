@@ -19,6 +19,22 @@ FoundContainer snapshot(const std::shared_ptr<ZORMetadata>& record) {
     return {.record = record, .uuid = record->uuid(), .path = record->url().path(), .existed = record->existed()};
 }
 
+/// A container that was built and that nobody has needed goes to death row.
+class Unused {
+public:
+    explicit Unused(ContainerMaker& maker) : maker_(maker) {}
+    Unused(const Unused&) = delete;
+    Unused& operator=(const Unused&) = delete;
+    ~Unused() {
+        if (container)
+            maker_.discard(*container);
+    }
+    std::optional<ContainerMaker::Built> container;
+
+private:
+    ContainerMaker& maker_;
+};
+
 } // namespace
 
 Result<FoundContainer> Creation::createOrLookupContainerForUser(const Caller& caller, std::uint32_t userId,
@@ -33,13 +49,15 @@ Result<FoundContainer> Creation::createOrLookupContainerForUser(const Caller& ca
                 return FoundContainer{
                     .record = live->record, .uuid = live->uuid, .path = std::move(live->path), .existed = true};
             }
-        FoundContainer found;
-        {
-            const AllIdentifiersWriteLock lock(needs_.locks);
-            found = TRY(createOrLookup({caller, userId, *identifier, containerClass, options}, lock));
+        const Wanted wanted{caller, userId, *identifier, containerClass, options};
+        Unused built(needs_.maker);
+        auto found = TRY(lookedFor(wanted, &built.container));
+        if (!found) {
+            built.container = TRY(needs_.maker.build(userId, *identifier, containerClass));
+            found = TRY(lookedFor(wanted, &built.container));
         }
-        TRY(makeDurable(found));
-        return found;
+        TRY(makeDurable(*found));
+        return std::move(*found);
     });
 }
 
@@ -50,7 +68,7 @@ Result<FoundContainer> Creation::createOrLookupContainerForUser(const Caller& ca
                                                                 const AllIdentifiersWriteLock& lock) {
     return needs_.boundary.run({function, __LINE__}, [&]() -> Result<FoundContainer> {
         TRY(checkRequest(caller, userId, identifier, containerClass));
-        return createOrLookup({caller, userId, *identifier, containerClass, options}, lock);
+        return *TRY(createOrLookup({caller, userId, *identifier, containerClass, options}, nullptr, lock));
     });
 }
 
@@ -74,11 +92,27 @@ Result<void> Creation::checkRequest(const Caller& caller, std::uint32_t userId, 
     return {};
 }
 
-Result<FoundContainer> Creation::createOrLookup(const Wanted& wanted, const AllIdentifiersWriteLock& lock) {
+Result<std::optional<FoundContainer>> Creation::lookedFor(const Wanted& wanted,
+                                                          std::optional<ContainerMaker::Built>* built) {
+    const AllIdentifiersWriteLock lock(needs_.locks);
+    return createOrLookup(wanted, built, lock);
+}
+
+Result<std::optional<FoundContainer>> Creation::createOrLookup(const Wanted& wanted,
+                                                               std::optional<ContainerMaker::Built>* built,
+                                                               const AllIdentifiersWriteLock& lock) {
     const auto& [caller, userId, identifier, containerClass, options] = wanted;
     UserHome* const home = isPerUserClass(containerClass) ? needs_.configuration.homeOf(userId) : nullptr;
     std::uint64_t homeGeneration = home ? home->lookIfDue().generation : 0;
     auto record = needs_.cache.containerForUser(userId, containerClass, &identifier, options.transient);
+    const bool isNeeded = record ? options.transient : record.error().is(ErrorCode::notFound);
+    // A replace that waits comes first, and might take what is being built in staging for what it waits for.
+    if (isNeeded && options.createIfNecessary && built && !*built && needs_.recovery.noneWaits()) {
+        // A refusal must not cost the disk's time. The rest is asked when there is something to put in place.
+        if (!record && !options.replacesAnother)
+            TRY(checkShare(wanted));
+        return std::nullopt;
+    }
     if (!record && options.createIfNecessary && home && record.error().is(ErrorCode::notFound)) {
         const std::uint64_t before = homeGeneration;
         homeGeneration = home->look().generation;
@@ -106,7 +140,7 @@ Result<FoundContainer> Creation::createOrLookup(const Wanted& wanted, const AllI
     // One in the place of another makes the user's share no larger.
     if (!record && !options.replacesAnother)
         TRY(checkShare(wanted));
-    return create(wanted, homeGeneration);
+    return TRY(create(wanted, built, homeGeneration));
 }
 
 Result<void> Creation::checkShare(const Wanted& wanted) {
@@ -135,13 +169,14 @@ Result<void> Creation::discardTransient(const ZORMetadata& record, const std::st
     return needs_.cache.removeContainerForUser(record.uid(), record.containerClass(), &identifier, true);
 }
 
-Result<FoundContainer> Creation::create(const Wanted& wanted, std::uint64_t homeGeneration) {
+Result<FoundContainer> Creation::create(const Wanted& wanted, std::optional<ContainerMaker::Built>* built,
+                                        std::uint64_t homeGeneration) {
     const bool transient = wanted.options.transient;
-    const auto [record, live] = TRY(needs_.maker.make({.userId = wanted.userId,
-                                                       .identifier = wanted.identifier,
-                                                       .containerClass = wanted.containerClass,
-                                                       .transient = transient,
-                                                       .homeGeneration = homeGeneration}));
+    const ContainerMaker::Built mine =
+        built && *built ? *std::exchange(*built, std::nullopt)
+                        : TRY(needs_.maker.build(wanted.userId, wanted.identifier, wanted.containerClass));
+    const FileURL live = TRY(needs_.maker.putInPlace(mine, transient, homeGeneration));
+    const auto& record = mine.record;
     record->setExisted(false);
     record->setTransient(transient);
     const auto added = needs_.cache.addContainerMetadata(record, wanted.userId, ContainerPlace(live), transient);

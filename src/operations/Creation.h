@@ -2,9 +2,12 @@
 // Finding a container, and making it where it is missing.
 //
 // Creation.cc says who may have which container and which record answers; ContainerMaker puts a new one on the disk and
-// says what a stop leaves. The sync after the move runs when the all-identifiers lock is released, so those of
-// concurrent creators share the disk's commit. Until it is done the record says so, and whoever finds it meanwhile
-// waits for a sync of its own before it answers. Any thread.
+// says what a stop leaves.
+//
+// Nobody waits for another's disk: a container is looked for under the all-identifiers lock, built in staging without
+// it, looked for again and moved into its place under it, and the sync after the move runs when it is released. One
+// that somebody else has made meanwhile is the answer, and the double goes to death row. Until that last sync is done
+// the record says so, and whoever finds it meanwhile waits for a sync of its own before it answers. Any thread.
 #pragma once
 
 #include "base/ContainerClass.h"
@@ -24,6 +27,7 @@
 
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 
 namespace zor {
@@ -86,12 +90,19 @@ private:
     };
     Result<void> checkRequest(const Caller& caller, std::uint32_t userId, const std::string* identifier,
                               ContainerClass containerClass);
-    Result<FoundContainer> createOrLookup(const Wanted& wanted, const AllIdentifiersWriteLock& lock);
+    /// createOrLookup under the lock.
+    Result<std::optional<FoundContainer>> lookedFor(const Wanted& wanted, std::optional<ContainerMaker::Built>* built);
+    /// `built`: nullptr builds under the lock. Otherwise it is what the caller has built, or where it has nothing yet
+    /// the answer is nothing when it has to build first; what is used of it is taken.
+    Result<std::optional<FoundContainer>> createOrLookup(const Wanted& wanted,
+                                                         std::optional<ContainerMaker::Built>* built,
+                                                         const AllIdentifiersWriteLock& lock);
     /// Error 38 when the user of the container has as many as one may have.
     Result<void> checkShare(const Wanted& wanted);
     Result<void> discardTransient(const ZORMetadata& record, const std::string& identifier);
     /// `homeGeneration`: of the home in which the container was looked for and not found.
-    Result<FoundContainer> create(const Wanted& wanted, std::uint64_t homeGeneration);
+    Result<FoundContainer> create(const Wanted& wanted, std::optional<ContainerMaker::Built>* built,
+                                  std::uint64_t homeGeneration);
 
     const Needs needs_;
 };
