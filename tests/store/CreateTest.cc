@@ -7,8 +7,12 @@
 
 #include <algorithm>
 #include <array>
+#include <chrono>
+#include <future>
 #include <gtest/gtest.h>
 #include <set>
+#include <unistd.h>
+#include <utility>
 
 namespace zor::test {
 namespace {
@@ -252,7 +256,7 @@ TEST_F(Create, LookupsWithoutTheLockGiveWay) {
              const std::string home = world.path("private/var/mobile");
              ::rename(home.c_str(), (home + ".old").c_str());
              world.makeDirectories("private/var/mobile", mobile);
-             (void)world.services().store().configuration.homeOf(mobile)->look();
+             (void)world.services().configuration().homeOf(mobile)->look();
          },
          true},
     };
@@ -262,7 +266,37 @@ TEST_F(Create, LookupsWithoutTheLockGiveWay) {
         row.disturb(world.make(id));
         Composition& store = world.services();
         EXPECT_EQ(!lookUpUndisturbed(store.locks(), store.cache(), mobile, application, id), row.givesWay);
+        Composition& services = world.services();
+        EXPECT_EQ(!lookUpUndisturbed(services.locks(), services.cache(), mobile, application, id), row.givesWay);
     }
+}
+
+// Goal: nobody waits for the disk that another's creation waits for, and of two that make the same one the later
+// finds the earlier's. Method: while one is being built, others look, make another, and make the same.
+TEST_F(Create, IsBuiltBesideOthers) {
+    const FoundContainer there = world.make("there");
+    FoundContainer first;
+    bool entered = false;
+    world.disk().before = [&](const DiskCallInfo& call) {
+        if (call.call != DiskCall::changeMode || std::exchange(entered, true))
+            return;
+        auto others = std::async(std::launch::async, [&] {
+            EXPECT_EQ(world.find("there").value().uuid, there.uuid);
+            EXPECT_TRUE(world.create("another"));
+            first = world.make("same");
+        });
+        ASSERT_EQ(others.wait_for(std::chrono::seconds(20)), std::future_status::ready);
+    };
+    const FoundContainer second = world.make("same");
+    world.disk().before = nullptr;
+    ASSERT_TRUE(entered);
+    EXPECT_FALSE(first.existed);
+    EXPECT_TRUE(second.existed);
+    EXPECT_EQ(second.uuid, first.uuid);
+    EXPECT_EQ(listed(), (std::set<std::string>{"another", "same", "there"}));
+    EXPECT_TRUE(world.names(staging).empty());
+    world.drainDeathRow();
+    EXPECT_TRUE(world.names(dead).empty());
 }
 
 // Goal: users can leave only so much behind in memory, whatever class it is of and over restarts; owners of the root,
@@ -303,9 +337,49 @@ TEST_F(Create, UsersHaveShares) {
         EXPECT_EQ(set(*asUser(), group, again ? 800 : 900), again ? ErrorCode::success : refused); // less always fits
         EXPECT_EQ(set(world.daemonsClient(), group, 900), ErrorCode::success);
         world.restart();
-    }
-    EXPECT_TRUE(world.create("d"));
-}
+        // Goal: users can leave only so much behind in memory, whatever class it is of and over restarts; owners of the
+        // root, and what takes another's place, are not kept out. Method: small limits.
+        TEST_F(Create, UsersHaveShares) {
+            constexpr auto group = ContainerClass::sharedAppGroup;
+            const auto asUser = [&] {
+                return world.client({.bundleIdentifier = "x", .userId = mobile, .allowOtherIdLookup = true});
+            };
+            const auto make = [&](const std::string& identifier, ContainerClass containerClass, bool transient = false,
+                                  std::uint32_t userId = mobile) {
+                return asUser()->createOrLookupContainerForUser(userId, &identifier, containerClass,
+                                                                {.createIfNecessary = true, .transient = transient});
+            };
+            const std::string key = "a";
+            const auto set = [&](ZORClientConnection& client, ContainerClass containerClass, std::size_t bytes) {
+                const plist::Value value(std::string(bytes, 'x'));
+                const auto uuid = make(key, containerClass).value().uuid;
+                return codeOf(client.setInfoValue(&value, &key, {mobile, uuid, key, containerClass}, UseLocking::yes));
+            };
+            for (const bool again : {false, true}) {
+                world.services().store().limits = {.containersMaxPerUser = 3, .infoBytesMaxPerUser = 1000};
+                EXPECT_TRUE(make("a", application));
+                EXPECT_TRUE(make("a", application, asTransient));
+                EXPECT_TRUE(make("a", group));
+                for (const auto containerClass : {application, ContainerClass::dataTempDir, group})
+                    EXPECT_EQ(complaintOf(make("d", containerClass)),
+                              "38 User 501 has 3 containers, and no more may be made: d. Delete some, or start "
+                              "zorvaned with a "
+                              "larger --containers-per-user");
+                EXPECT_TRUE(make("a", application, asTransient)); // in the place of the one that was
+                EXPECT_TRUE(asUser()->deleteDataContainerContentForUser(mobile, &key, application));
+                EXPECT_TRUE(make("a", application, asTransient));
+                EXPECT_TRUE(make("a", ContainerClass::bundleApplication, false, bundleOwnerUserId)); // another's share
+                constexpr auto refused = ErrorCode::propertyListNotWritten;
+                EXPECT_EQ(set(*asUser(), application, 700), again ? refused : ErrorCode::success);
+                EXPECT_EQ(set(*asUser(), application, 100), again ? refused : ErrorCode::success);
+                EXPECT_EQ(set(*asUser(), application, 1000), refused);
+                EXPECT_EQ(set(*asUser(), group, again ? 800 : 900),
+                          again ? ErrorCode::success : refused); // less always fits
+                EXPECT_EQ(set(world.daemonsClient(), group, 900), ErrorCode::success);
+                world.restart();
+            }
+            EXPECT_TRUE(world.create("d"));
+        }
 
-} // namespace
+    } // namespace
 } // namespace zor::test

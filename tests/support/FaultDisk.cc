@@ -72,6 +72,8 @@ int FaultDisk::faultOf(const DiskCallInfo& info) {
 }
 
 ssize_t FaultDisk::intercept(const DiskCallInfo& info, const Make& make) {
+    if (before)
+        before(info);
     const int fault = faultOf(info);
     return fault != 0 ? fault : make();
 }

@@ -65,6 +65,8 @@ public:
         return refused != 0 ? -refused : InterceptedDisk::read(fd, bytes);
     }
     std::function<int(int fd)> unreadable;
+    /// Runs before each call, on its thread and under no lock of this disk's.
+    std::function<void(const DiskCallInfo&)> before;
 
 protected:
     ssize_t intercept(const DiskCallInfo& info, const Make& make) override;
