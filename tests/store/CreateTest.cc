@@ -264,8 +264,6 @@ TEST_F(Create, LookupsWithoutTheLockGiveWay) {
         SCOPED_TRACE(row.what);
         const std::string id = "id" + std::to_string(&row - rows);
         row.disturb(world.make(id));
-        Composition& store = world.services();
-        EXPECT_EQ(!lookUpUndisturbed(store.locks(), store.cache(), mobile, application, id), row.givesWay);
         Composition& services = world.services();
         EXPECT_EQ(!lookUpUndisturbed(services.locks(), services.cache(), mobile, application, id), row.givesWay);
     }
@@ -337,49 +335,9 @@ TEST_F(Create, UsersHaveShares) {
         EXPECT_EQ(set(*asUser(), group, again ? 800 : 900), again ? ErrorCode::success : refused); // less always fits
         EXPECT_EQ(set(world.daemonsClient(), group, 900), ErrorCode::success);
         world.restart();
-        // Goal: users can leave only so much behind in memory, whatever class it is of and over restarts; owners of the
-        // root, and what takes another's place, are not kept out. Method: small limits.
-        TEST_F(Create, UsersHaveShares) {
-            constexpr auto group = ContainerClass::sharedAppGroup;
-            const auto asUser = [&] {
-                return world.client({.bundleIdentifier = "x", .userId = mobile, .allowOtherIdLookup = true});
-            };
-            const auto make = [&](const std::string& identifier, ContainerClass containerClass, bool transient = false,
-                                  std::uint32_t userId = mobile) {
-                return asUser()->createOrLookupContainerForUser(userId, &identifier, containerClass,
-                                                                {.createIfNecessary = true, .transient = transient});
-            };
-            const std::string key = "a";
-            const auto set = [&](ZORClientConnection& client, ContainerClass containerClass, std::size_t bytes) {
-                const plist::Value value(std::string(bytes, 'x'));
-                const auto uuid = make(key, containerClass).value().uuid;
-                return codeOf(client.setInfoValue(&value, &key, {mobile, uuid, key, containerClass}, UseLocking::yes));
-            };
-            for (const bool again : {false, true}) {
-                world.services().store().limits = {.containersMaxPerUser = 3, .infoBytesMaxPerUser = 1000};
-                EXPECT_TRUE(make("a", application));
-                EXPECT_TRUE(make("a", application, asTransient));
-                EXPECT_TRUE(make("a", group));
-                for (const auto containerClass : {application, ContainerClass::dataTempDir, group})
-                    EXPECT_EQ(complaintOf(make("d", containerClass)),
-                              "38 User 501 has 3 containers, and no more may be made: d. Delete some, or start "
-                              "zorvaned with a "
-                              "larger --containers-per-user");
-                EXPECT_TRUE(make("a", application, asTransient)); // in the place of the one that was
-                EXPECT_TRUE(asUser()->deleteDataContainerContentForUser(mobile, &key, application));
-                EXPECT_TRUE(make("a", application, asTransient));
-                EXPECT_TRUE(make("a", ContainerClass::bundleApplication, false, bundleOwnerUserId)); // another's share
-                constexpr auto refused = ErrorCode::propertyListNotWritten;
-                EXPECT_EQ(set(*asUser(), application, 700), again ? refused : ErrorCode::success);
-                EXPECT_EQ(set(*asUser(), application, 100), again ? refused : ErrorCode::success);
-                EXPECT_EQ(set(*asUser(), application, 1000), refused);
-                EXPECT_EQ(set(*asUser(), group, again ? 800 : 900),
-                          again ? ErrorCode::success : refused); // less always fits
-                EXPECT_EQ(set(world.daemonsClient(), group, 900), ErrorCode::success);
-                world.restart();
-            }
-            EXPECT_TRUE(world.create("d"));
-        }
+    }
+    EXPECT_TRUE(world.create("d"));
+}
 
-    } // namespace
+} // namespace
 } // namespace zor::test

@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // What a change of entitlements makes of the map and its file, of system containers and of groups; reconciliation; and
 // what a lost file keeps from being deleted.
-#include "store/ZOREntitlementMapping.h"
 #include "operations/ZORGroupManager.h"
+#include "store/ZOREntitlementMapping.h"
 #include "world/World.h"
 
 #include <algorithm>
@@ -37,8 +37,8 @@ protected:
     ZOREntitlementMapping& mapping() { return world.services().entitlements(); }
     ErrorCode process(const std::optional<Dictionary>& entitlements, const std::optional<std::string>& identifier,
                       const Dictionary& options = {}) {
-        return mapping().processEntitlements(entitlements ? &*entitlements : nullptr,
-                                             identifier ? &*identifier : nullptr, &options);
+        return world.services().store().entitlementChange.processEntitlements(
+            entitlements ? &*entitlements : nullptr, identifier ? &*identifier : nullptr, &options);
     }
     std::string make(std::uint32_t user, const std::string& identifier, ContainerClass containerClass) {
         return world.make(identifier, containerClass, false, user).path;
@@ -222,7 +222,8 @@ TEST_F(Processing, TheMapAfterEachCall) {
     ASSERT_TRUE(
         mapping()._setEntitlementDictionaryValues({Dictionary{{"a", Array{"b", placeholder, 5, "c"}}}}, {children}));
     ASSERT_EQ(process(e, "kept", caller), success);
-    mapping().removeEntitlementDictionariesForIdentifierAndItsChildren("a");
+    world.services().store().entitlementChange.removeEntitlementDictionariesForIdentifierAndItsChildren(
+        "a", AllIdentifiersWriteLock(world.services().locks()));
     EXPECT_EQ(mapping().entitlementMappingDict(), (Dictionary{{"kept", e}, {byCaller, Dictionary{{"kept", true}}}}));
 }
 

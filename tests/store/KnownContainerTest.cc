@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // What is asked of one container by its UUID: info values, its record, its structure, its directory's name, its size.
-#include "store/ZOREntitlementMapping.h"
 #include "operations/ZORGroupManager.h"
+#include "store/ZOREntitlementMapping.h"
 #include "support/OpenWatch.h"
 #include "world/World.h"
 
@@ -223,7 +223,8 @@ TEST_F(Known, OperationsRunTogether) {
     const plist::Dictionary groups{{std::string(entitlementKeys::applicationGroups), plist::Array{"group"}}};
     const std::string names[] = {"holder", "other"};
     ZOREntitlementMapping& mapping = world.services().entitlements();
-    ASSERT_EQ(mapping.processEntitlements(&groups, &names[0], nullptr), ErrorCode::success);
+    EntitlementChange& change = world.services().store().entitlementChange;
+    ASSERT_EQ(change.processEntitlements(&groups, &names[0], nullptr), ErrorCode::success);
     const std::string group = world.make("group", ContainerClass::sharedAppGroup).path;
     std::atomic<bool> end{false};
     const std::function<void(int)> operations[] = {
@@ -235,13 +236,14 @@ TEST_F(Known, OperationsRunTogether) {
         [&](int) { EXPECT_EQ(client().containersForUser(mobile, application, false)->size(), 1U); },
         [&](int) { EXPECT_TRUE(world.find("com.example")); },
         [&](int i) {
-            EXPECT_EQ(mapping.processEntitlements(i % 2 == 0 ? &groups : nullptr, &names[1], nullptr),
+            EXPECT_EQ(change.processEntitlements(i % 2 == 0 ? &groups : nullptr, &names[1], nullptr),
                       ErrorCode::success);
             EXPECT_EQ(mapping.entitlementsExistForIdentifier(names[1]), i % 2 == 0);
         },
         [&](int) {
-            EXPECT_EQ(world.services().groups().groupContainerPathsForUser(mobile, client(), &names[0]).value(),
-                      (ZORGroupManager::Paths{{"group", group}}));
+            EXPECT_EQ(
+                world.services().groups().groupContainerPathsForUser(mobile, client().caller(), &names[0]).value(),
+                (ZORGroupManager::Paths{{"group", group}}));
         },
     };
     inParallel(static_cast<int>(std::size(operations)), [&](int thread) {
@@ -250,8 +252,8 @@ TEST_F(Known, OperationsRunTogether) {
         end = end || thread == 0;
     });
     EXPECT_EQ(world.services().locks().identifiersInUse(), 0U);
-    ASSERT_EQ(mapping.processEntitlements(nullptr, &names[1], nullptr), ErrorCode::success);
-    ASSERT_EQ(mapping.processEntitlements(nullptr, &names[0], nullptr), ErrorCode::success);
+    ASSERT_EQ(change.processEntitlements(nullptr, &names[1], nullptr), ErrorCode::success);
+    ASSERT_EQ(change.processEntitlements(nullptr, &names[0], nullptr), ErrorCode::success);
     EXPECT_FALSE(isThere(group));
 }
 

@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // What the daemon could not look at, for want of descriptors or because the disk refused: it deletes nothing for that,
 // and keeps no answer that came of it.
-#include "store/ZOREntitlementMapping.h"
 #include "store/ReplaceJournal.h"
+#include "store/ZOREntitlementMapping.h"
 #include "support/FewDescriptors.h"
 #include "world/World.h"
 
@@ -21,17 +21,18 @@ protected:
 
     /// The daemon ended after the first of a replace's two moves.
     void stopAReplaceOf(const FoundContainer& old) {
-        StoreServices& store = world.services().store();
+        Composition& store = world.services();
         const UUID uuid = UUID::random();
         const FileURL oldUrl = FileURL::directory(old.path);
         const ReplaceJournal journal{.oldUrl = oldUrl,
                                      .newUrl = oldUrl,
                                      .stagingUrl =
-                                         store.configuration.stagingDirectory().appendingDirectory(uuid.string()),
+                                         store.configuration().stagingDirectory().appendingDirectory(uuid.string()),
                                      .destUrl = oldUrl};
-        ASSERT_TRUE(journal._writeToDiskReplaceAt(
-            store.log, store.fileManager, ReplaceJournal::urlFor(store.configuration.replaceDirectory(), uuid)));
-        ASSERT_TRUE(store.fileManager.moveItemAtURL(oldUrl, journal.stagingUrl));
+        ASSERT_TRUE(
+            journal._writeToDiskReplaceAt(store.log(), store.defaultManager(),
+                                          ReplaceJournal::urlFor(store.configuration().replaceDirectory(), uuid)));
+        ASSERT_TRUE(store.defaultManager().moveItemAtURL(oldUrl, journal.stagingUrl));
     }
     void relaunch() {
         world.restart();
@@ -140,7 +141,7 @@ TEST_F(Shortage, EachOperationWithFewDescriptors) {
          remember},
         {"size",
          [&] {
-             world.services().store().usageSettledTime = {};
+             world.services().store().diskUsage.settledTime = {};
              makeOld(ContainerClass::bundleApplication);
          },
          size,
@@ -217,7 +218,7 @@ TEST_F(Shortage, AnEntitlementThatWasNotSavedIsSavedWhenAskedAgain) {
     const plist::Dictionary entitlements{{"k", "v"}};
     world.disk().arm({.filter = [](const support::DiskCallInfo&) -> bool { throw std::bad_alloc(); }});
     const auto process = [&] {
-        return world.services().entitlements().processEntitlements(&entitlements, &identifier, nullptr);
+        return world.services().store().entitlementChange.processEntitlements(&entitlements, &identifier, nullptr);
     };
     EXPECT_EQ(process(), ErrorCode::exceptionCaught);
     world.disk().disarm();
