@@ -5,6 +5,7 @@
 #include "ipc/Keys.h"
 
 #include <fcntl.h>
+#include <thread>
 #include <unistd.h>
 
 namespace zorvane {
@@ -16,6 +17,8 @@ namespace {
 
 /// Whoever asks has been waiting already.
 constexpr std::uint32_t askMillisecondsMax = 1000;
+/// A daemon that listens, and accepts nobody now, is there.
+constexpr std::uint32_t connectMillisecondsMax = 50;
 
 Error error(Error::Kind kind, std::string message, std::string advice) {
     return {.kind = kind, .code = 0, .message = std::move(message), .advice = std::move(advice)};
@@ -63,24 +66,36 @@ Error whyKnownButRefused(const plist::Dictionary& status, const plist::Dictionar
                  "are said there");
 }
 
+/// Nor for commands: a daemon may be without its status socket.
+bool nobodyListens(ConnectOptions options) {
+    options.timeoutMilliseconds = connectMillisecondsMax;
+    const auto connection = Client::Connection::open(options, Client::Connection::Service::commands);
+    return !connection && connection.error().kind == Error::Kind::unreachable;
+}
+
 } // namespace
 
 Error whyEnded(const ConnectOptions& options, std::chrono::milliseconds age) {
     ConnectOptions quick = options;
     quick.timeoutMilliseconds = askMillisecondsMax;
-    auto connection = Client::Connection::open(quick, Client::Connection::Service::status);
-    if (!connection && connection.error().kind == Error::Kind::unreachable &&
-        !Client::Connection::open(quick, Client::Connection::Service::commands))
-        return error(
-            Error::Kind::unreachable, "zorvaned ended while the call waited, and is not there any more",
-            "start the daemon (systemctl start zorvaned) and look into its log; what the call was to change may "
-            "have been done or not");
-    if (connection) {
-        connection->startTime(askMillisecondsMax);
-        if (const auto reply = connection->receive())
-            if (const plist::Dictionary* peer = reply->content.dictionary(keys::statusPeer))
-                return peer->isTrue(keys::peerKnown) ? whyKnownButRefused(reply->content, *peer, age)
-                                                     : whyNotKnown(*peer);
+    const auto giveUp = Clock::now() + std::chrono::milliseconds(askMillisecondsMax / 4);
+    for (;;) {
+        auto connection = Client::Connection::open(quick, Client::Connection::Service::status);
+        if (!connection && connection.error().kind == Error::Kind::unreachable && nobodyListens(options))
+            return error(Error::Kind::unreachable, "zorvaned ended while the call waited, and is not there any more",
+                         "start the daemon (systemctl start zorvaned) and look into its log; what the call was to "
+                         "change may have been done or not");
+        if (connection) {
+            connection->startTime(askMillisecondsMax);
+            if (const auto reply = connection->receive())
+                if (const plist::Dictionary* peer = reply->content.dictionary(keys::statusPeer))
+                    return peer->isTrue(keys::peerKnown) ? whyKnownButRefused(reply->content, *peer, age)
+                                                         : whyNotKnown(*peer);
+        }
+        // The kernel closes a dying daemon's descriptors one after another: the sockets may still listen.
+        if (Clock::now() >= giveUp)
+            break;
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
     }
     return error(Error::Kind::refused,
                  std::string(endedWithoutAnswer) + ", and does not tell whom it takes this program for",

@@ -75,6 +75,8 @@ std::expected<DaemonOptions, OptionsEnd> parseDaemonOptions(int argumentCount, c
         const int next = ::getopt_long(argumentCount, arguments, ":hV", known, nullptr);
         switch (next) {
         case -1:
+            if (optind < argumentCount && std::strcmp(arguments[optind], "help") == 0)
+                return std::unexpected(OptionsEnd{help, 0});
             if (optind < argumentCount)
                 return std::unexpected(usage(std::string("unexpected argument '") + arguments[optind] + "'"));
             return options;

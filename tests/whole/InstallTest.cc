@@ -172,7 +172,10 @@ TEST(Install, DirectoryThenArchive) {
                 EXPECT_TRUE(std::filesystem::is_directory(path + standard)) << standard;
         }
         writeFile(place.path() + "/archive", makeArchive(Form::tarXz, {file("only/f", "new")}));
-        const auto second = installed(place.path() + "/archive");
+        std::vector<std::string> piped = {"/bin/sh", "-c", "cat \"$0\" | \"$@\"", place.path() + "/archive"};
+        for (const std::string& word : installing(daemon.root(), "-", containerClass))
+            piped.push_back(word);
+        const auto second = runProgram(piped);
         ASSERT_EQ(second.exitStatus, 0) << second.output;
         EXPECT_NE(second.output.find("\"replaced\": true"), std::string::npos) << second.output;
         const std::string newPath = pathOf(daemon, containerClass);

@@ -177,6 +177,7 @@ TEST(Run, CommandLines) {
     };
     const Row rows[] = {
         {{"--help"}, 0, "Examples:"},
+        {{"help"}, 0, "Examples:"},
         {{"-V"}, 0, "zorvane-run "},
         {{"--json", "--nothing", "sh"}, 125, "\"exitCode\": 125"},
         {{}, 125, "--identifier is missing"},

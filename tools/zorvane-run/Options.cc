@@ -182,6 +182,8 @@ std::expected<Options, OptionsEnd> parseOptions(int argumentCount, char** argume
         if (auto end = take(next, optarg, arguments[optind - 1], options))
             return std::unexpected(std::move(*end));
     options.command.assign(arguments + optind, arguments + argumentCount);
+    if (argumentCount == 2 && options.command == std::vector<std::string>{"help"})
+        return std::unexpected(OptionsEnd{.text = help, .exitCode = exitDone});
     if (options.identifier.empty())
         return std::unexpected(usage("--identifier is missing, or empty"));
     if (options.userText.empty())
