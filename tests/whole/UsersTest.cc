@@ -1,6 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // A root from nothing to its first containers, and one whose users have numbers of its own: what daemon, tool, library
 // and check make of it.
+#include "device/SemaphoreBootMarker.h"
+#include "os/SystemRoot.h"
 #include "process/DaemonProcess.h"
 #include "support/FileTree.h"
 
@@ -70,6 +72,8 @@ TEST(Users, InitMakesARootThatWorks) {
     EXPECT_EQ(checked.exitStatus, 0) << checked.output;
     daemon.signal(SIGTERM);
     EXPECT_EQ(daemon.wait(), 0);
+    // The marker of this root is a semaphore that would outlive it.
+    platform::SemaphoreBootMarker(*platform::SystemRoot::open(root)).forget();
 }
 
 // Goal: configured users own what the usual ones do elsewhere, and a stranger's number is nobody's. Method: a root with
