@@ -202,7 +202,7 @@ void ContainerMaker::discard(const Built& built) noexcept {
     try {
         (void)needs_.deathRow._moveItemAtURLToDeathRow(built.staging, StartDeletionThread::yes);
     } catch (const std::bad_alloc&) {
-        // The next launch sweeps staging.
+        return; // the next launch sweeps staging
     }
 }
 

@@ -37,10 +37,10 @@ std::optional<UsableDirectory> ZORPerUserConfiguration::openHome() {
         return std::nullopt;
     auto opened = fileManager_.resolver().openDirectoryPath(*home);
     if (!opened)
-        return judged(std::move(*home),
+        return judged(*home,
                       posixError(ZOR_HERE, opened.error(), "open of the home failed: %s", errorText(opened.error())),
                       "userHomeDirectory", "user base");
-    return UsableDirectory{.url = std::move(*home), .opened = std::move(*opened)};
+    return UsableDirectory{.url = *home, .opened = std::move(*opened)};
 }
 
 UsableDirectory ZORPerUserConfiguration::judged(FileURL url, Result<platform::FileDescriptor> opened,
