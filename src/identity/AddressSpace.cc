@@ -63,7 +63,7 @@ bool AddressSpace::isTold() {
         const FileDescriptor self(::open("/proc/self", O_PATH | O_DIRECTORY | O_CLOEXEC));
         int begin[2] = {};
         int end[2] = {};
-        if (!opened(self.get()).lives() || ::pipe2(begin, O_CLOEXEC) != 0)
+        if (!self.valid() || !opened(self.get()).lives() || ::pipe2(begin, O_CLOEXEC) != 0)
             return false;
         const FileDescriptor beginReading(begin[0]);
         FileDescriptor beginWriting(begin[1]);
