@@ -49,7 +49,7 @@ private:
     zor::platform::FileDescriptor socket_;
     ConnectOptions options_;
     Clock::time_point connected_ = Clock::now();
-    /// Of the call that goes on.
+    /// The fields of the call that goes on.
     std::uint32_t limitMilliseconds_ = 0;
     std::optional<Clock::time_point> deadline_;
     std::uint64_t lastId_ = 0;

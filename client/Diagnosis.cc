@@ -15,7 +15,7 @@ namespace keys = zor::ipc::keys;
 
 namespace {
 
-/// Whoever asks has been waiting already.
+/// A caller that asks has been waiting already.
 constexpr std::uint32_t askMillisecondsMax = 1000;
 /// A daemon that listens, and accepts nobody now, is there.
 constexpr std::uint32_t connectMillisecondsMax = 50;

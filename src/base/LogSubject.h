@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the log lines of a thread are about: an error's code, and the request that provoked them. For sinks that keep
+// The subject of a thread's log lines: an error's code, and the request that provoked them. For sinks that keep
 // more of a line than its text. Costs nothing until a line is written; each thread has its own.
 #pragma once
 
@@ -17,7 +17,7 @@ struct LogSubject {
     using Take = std::function<void(std::string_view name, std::string_view value)>;
     const std::function<void(const Take&)>* request = nullptr;
 
-    /// Of this thread, now.
+    /// The subject of this thread, now.
     [[nodiscard]] static const LogSubject& current();
 };
 

@@ -76,7 +76,7 @@ public:
 
     [[nodiscard]] const platform::SystemRoot& root() const { return root_; }
     [[nodiscard]] const platform::PasswordDatabase& passwords() const { return passwords_; }
-    /// Who owns containers here, as a daemon would read it.
+    /// The owners of containers here, as a daemon would read them.
     [[nodiscard]] const ipc::UserNumbers& users() const { return configured_.numbers; }
     [[nodiscard]] const std::vector<std::string>& userDoubts() const { return configured_.doubts; }
     [[nodiscard]] const platform::BootMarker& bootMarker() const { return bootMarker_; }

@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// What waits for its deletion, on the daemon's death row and on those of other file systems. Reads alone; one thread.
+// The items that wait for their deletion, on the daemon's death row and on those of other file systems. Reads alone;
+// one thread.
 #pragma once
 
 #include "check/CheckedSystem.h"

@@ -15,7 +15,7 @@ namespace zor::check {
 
 namespace {
 
-/// What the whole system lacks or has too much of.
+/// Things that the whole system lacks or has too much of.
 void checkSystem(Look& look) {
     const CheckedSystem& system = look.device();
     for (const std::string& path : missingOf(system.root()))

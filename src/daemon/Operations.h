@@ -43,7 +43,7 @@
 namespace zor {
 
 struct Operations {
-    /// What lies below all of them.
+    /// The services that lie below all of them.
     struct Store {
         const Log& log;
         ExceptionBoundary& boundary;

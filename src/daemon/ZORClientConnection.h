@@ -44,7 +44,7 @@ public:
     [[nodiscard]] std::uint32_t clientUserId() const { return caller_.userId; }
     [[nodiscard]] bool onlyOwnIdentifier() const { return caller_.onlyOwnIdentifier; }
     [[nodiscard]] bool ownsRoot() const { return caller_.ownsRoot(); }
-    // What the client may look up beyond its own; handlers widen or narrow it.
+    // The lookups beyond its own that the client may make; handlers widen or narrow them.
     [[nodiscard]] bool allowOtherIdLookup() const { return caller_.allowOtherIdLookup; }
     void setAllowOtherIdLookup(bool allow) { caller_.allowOtherIdLookup = allow; }
     [[nodiscard]] bool allowGroupIdLookup() const { return allowGroupIdLookup_; }

@@ -129,7 +129,7 @@ void addPlatformCounters(platform::LinuxPlatform& platform, plist::Dictionary& c
                                             {"Doubts", plist::Array(doubts.begin(), doubts.end())}});
 }
 
-/// What the service manager shows of the daemon.
+/// The line that the service manager shows of the daemon.
 std::string shortStatus(const platform::SystemRoot& root, const platform::ListenerCounters& counters) {
     return "Serving " + root.canonicalPath() + ": " + std::to_string(counters.messages) + " requests so far, " +
            std::to_string(counters.connections) + " connections";

@@ -18,8 +18,8 @@ namespace zor::platform {
 class AddressSpace {
 public:
     AddressSpace() = default;
-    /// Of the process whose /proc directory is open. It counts as gone where the kernel does not let this process look
-    /// at it, or there is no descriptor for it.
+    /// The address space of the process whose /proc directory is open. It counts as gone where the kernel does not let
+    /// this process look at it, or there is no descriptor for it.
     [[nodiscard]] static AddressSpace of(int process);
     /// Whether it lives still, as far as this can tell. False where the kernel gives another answer than expected.
     [[nodiscard]] bool lives() const;

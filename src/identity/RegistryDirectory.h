@@ -66,7 +66,7 @@ public:
     RegistryDirectory(const SystemRoot& root, uid_t daemonUserId) : root_(root), daemonUserId_(daemonUserId) {}
 
     [[nodiscard]] RegistryListing list() const;
-    /// What is in a file that may be believed.
+    /// The content of a file that may be believed.
     [[nodiscard]] std::expected<std::string, RegistryProblem> bytes(const RegistryListing& listing,
                                                                     const std::string& name) const;
     [[nodiscard]] std::expected<RegistryEntry, RegistryProblem> read(const RegistryListing& listing,

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // The configuration of a system root, and what it says of users: read once, when a daemon starts or a tool looks.
 //
-// Whoever can write the file can give the installer's containers to anybody, so one that others than root and the
+// A user who can write the file can give the installer's containers to anybody, so one that others than root and the
 // daemon's user can write is refused. Any thread.
 #pragma once
 

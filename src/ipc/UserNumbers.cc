@@ -13,7 +13,7 @@ namespace {
 
 constexpr std::string_view sectionName = "users";
 
-/// What the file says of one number: nothing, or a text from a line.
+/// The file's word on one number: nothing, or a text from a line.
 struct Setting {
     std::string_view key;
     std::uint32_t UserNumbers::* number;
@@ -119,7 +119,7 @@ std::expected<void, std::string> judge(const UserNumbers& numbers) {
     return {};
 }
 
-/// Of an owner that nobody configured.
+/// The doubt about an owner that nobody configured.
 std::optional<std::string> doubtOf(const Setting& setting, std::uint32_t number, const Accounts& accounts) {
     if (setting.line != 0)
         return std::nullopt;

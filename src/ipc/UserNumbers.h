@@ -75,7 +75,7 @@ struct Accounts {
 
 struct ConfiguredUsers {
     UserNumbers numbers;
-    /// What is served as it is but should not stay so; each is a sentence that says what to do.
+    /// Things that are served as they are but should not stay so; each is a sentence that says what to do.
     std::vector<std::string> doubts;
 };
 

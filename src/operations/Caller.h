@@ -20,7 +20,7 @@ struct Caller {
     /// An owner of the root, as whom root and the daemon's own user are reported.
     [[nodiscard]] bool ownsRoot() const { return userId == 0; }
 
-    /// Whoever the daemon itself does something for: what a boot brings in line, what the kernel asks.
+    /// The caller for whom the daemon itself acts: what a boot brings in line, what the kernel asks.
     static Caller daemonItself() {
         return {.bundleIdentifier = "com.veltra.zorvaned.internal", .userId = 0, .allowOtherIdLookup = true};
     }

@@ -120,7 +120,7 @@ Result<void> ContainerBuilder::_createSubDirectories() {
 Result<void> ContainerBuilder::writeMetadata(const ZORMetadata& record) {
     const auto bytes = plist::writeBinary(record.fileContent());
     int status = bytes ? -EFBIG : -EINVAL;
-    // What no reader would take must not be acknowledged.
+    // A file that no reader would take must not be acknowledged.
     if (bytes && bytes->size() <= fs::metadataFileBytesMax)
         status = fs::writeNewFile(disk_, directory_.get(), names::metadataFile, metadataMode, *bytes);
     if (status >= 0) {

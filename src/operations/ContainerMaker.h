@@ -7,7 +7,7 @@
 //
 // Unlike a directory getter, a container is not there by halves: a mode or an owner that cannot be set fails the build.
 //
-// What a stop leaves: while it is built, a directory in staging, which the next launch moves to death row; after the
+// A stop leaves: while it is built, a directory in staging, which the next launch moves to death row; after the
 // move into the class directory, the container, whole. What a power cut leaves is the same: the metadata file's data is
 // on the disk before the move can be (fs/Durability.h).
 #pragma once

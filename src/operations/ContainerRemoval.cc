@@ -92,8 +92,8 @@ bool ContainerRemoval::takeAway(const FileURL& container, std::optional<std::uin
         changed.push_back(deathRow);
         return true;
     }
-    // What stopped the move would stop the removal too, half-way; and another's directory is not ours to remove. Then
-    // it stays whole.
+    // The cause that stopped the move would stop the removal too, half-way; and another's directory is not ours to
+    // remove. Then it stays whole.
     const bool stays = moved.error().isOwnShortage() || moved.error().isPosix(DeathRow::notTheContainer);
     const auto removed = stays ? Result<void>(moved.error()) : needs_.fileManager.removeItemAtURL(container);
     if (!removed) {

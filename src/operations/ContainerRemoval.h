@@ -2,7 +2,7 @@
 // One container leaves the store: it moves to death row, its mapping and its record go. Nothing is asked of what it was
 // registered for; that is the matter of who calls (Deletion, EntitlementChange, ZORGroupManager).
 //
-// What a stop leaves after the move: a mapping that points to nothing, which the next launch removes; the cache ends
+// A stop after the move leaves a mapping that points to nothing, which the next launch removes; the cache ends
 // with the process. Moves are on the disk before the caller hears of them. Any thread.
 #pragma once
 
@@ -62,7 +62,8 @@ public:
     /// `changed` gets the directories to be synced.
     Result<void> take(const ContainerToGo& container, const ZORMetadata& record, std::vector<FileURL>& changed,
                       const AllIdentifiersWriteLock& lock);
-    /// What has been taken is on the disk, whatever `staged` says of the rest. Without a lock where that can be.
+    /// Everything that has been taken is on the disk, whatever `staged` says of the rest. Without a lock where that can
+    /// be.
     Result<void> conclude(Result<void> staged, std::vector<FileURL> changed);
 
 private:

@@ -14,7 +14,7 @@ namespace {
 
 constexpr const char* function = "createOrLookupContainerForUser";
 
-/// What a reply needs of a record; the caller holds the lock that guards it.
+/// The part of a record that a reply needs; the caller holds the lock that guards it.
 FoundContainer snapshot(const std::shared_ptr<ZORMetadata>& record) {
     return {.record = record, .uuid = record->uuid(), .path = record->url().path(), .existed = record->existed()};
 }

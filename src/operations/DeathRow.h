@@ -7,7 +7,7 @@
 // the death-row queue; what is on death row belongs to no container. A stop at any point leaves items, or empty
 // directories of theirs, for the next pass; the launch queues one.
 //
-// Whoever owns the directory that holds a container can put a directory of another user's in its place. So it is asked
+// The owner of the directory that holds a container can put a directory of another user's in its place. So it is asked
 // before the move whose the directory is, and again when it has come to death row, where nobody can change it any more:
 // another's goes back. A pass waits for that: it takes no item while one is being moved.
 //
@@ -68,7 +68,7 @@ public:
     /// Removes an item, or moves it to the system's directory for temporary files. Error 4. On the death-row queue.
     Result<void> _removeItemOrMoveToTempAtURL(const FileURL& url);
 
-    /// What passes could not remove, for the status.
+    /// The items that passes could not remove, for the status.
     struct Left {
         /// So many paths are kept; the rest is counted.
         static constexpr std::size_t pathsMax = 64;
@@ -81,7 +81,7 @@ public:
                 paths.push_back(std::move(path));
         }
     };
-    /// Of the last pass.
+    /// The code of the last pass.
     [[nodiscard]] Left left() const ZOR_EXCLUDES(leftMutex_) {
         const platform::MutexLock held(leftMutex_);
         return left_;

@@ -41,7 +41,7 @@ Result<void> Deletion::stageForDeleteContainersWithUsers(const DeletionBatch& ba
             Result<void> first;
             for (std::size_t index = 0; index < count; ++index) {
                 auto one = stageForDelete(batch, index, changed, lock);
-                // What could not be looked for, or has to stay, keeps no other from going.
+                // A container that could not be looked for, or has to stay, keeps no other from going.
                 if (!one && !one.error().isOwnShortage() && !one.error().is(ErrorCode::journalUnusable))
                     return one;
                 if (!one && first)
@@ -75,7 +75,7 @@ Result<void> Deletion::stageForDelete(const DeletionBatch& batch, std::size_t in
     const auto record = TRY(needs_.removal.find(container, lock));
     if (!record)
         return {};
-    // What a transient one is for may not come to be: what is registered is still the live one's.
+    // The purpose of a transient one may not come to be: what is registered is still the live one's.
     if (isBundleClass(containerClass) && !record->transient())
         needs_.entitlementChange.removeEntitlementDictionariesForIdentifierAndItsChildren(*identifier, lock);
     return needs_.removal.take(container, *record, changed, lock);

@@ -6,10 +6,10 @@
 // number of them is too large for the memory, and none that fails keeps the others. What a power cut leaves is what was
 // on death row: nothing is removed whose move here could still be undone.
 //
-// What cannot be removed goes to the directory for temporary files, as root's and closed, and marked, so that later
-// passes, of later daemons too, know it for theirs: only root can set such a mark, and names in that directory are
-// anybody's to make. Killed between the steps, it is still on death row, closed. Nothing is copied: from another file
-// system than that directory's it stays on its death row, which is closed.
+// An item that cannot be removed goes to the directory for temporary files, as root's and closed, and marked, so that
+// later passes, of later daemons too, know it for theirs: only root can set such a mark, and names in that directory
+// are anybody's to make. Killed between the steps, it is still on death row, closed. Nothing is copied: from another
+// file system than that directory's it stays on its death row, which is closed.
 #include "fs/FileSystemDeathRow.h"
 #include "operations/DeathRow.h"
 #include "os/Openat2.h"
@@ -107,8 +107,7 @@ Result<void> DeathRow::forEachCondemned(int directory, const FileURL& row,
     bool first = true;
     const auto listed = needs_.fileManager.forEachItemIn(
         directory, row, ZORFileManager::Leftovers::shown, [&](int, const FileURL& item) {
-            // Where nothing keeps the order of changes, a power cut could else bring back a container that is half
-            // removed.
+            // A power cut could bring back a container that is half removed where nothing keeps the order of changes.
             const int status = first ? needs_.durability.beforeRemoval(directory) : 0;
             first = false;
             if (status < 0) {

@@ -67,7 +67,7 @@ Result<std::uint64_t> DiskUsage::diskUsage(const Caller& caller, const Container
                 return *kept;
         container = record->url();
         directory = needs_.fileManager.resolver().openDirectory(container);
-        // What another keeps in a directory that was renamed to the container's name is not told.
+        // The size of another's directory that was renamed to the container's name is not told.
         if (directory && !needs_.fileManager.judgeOwner(
                              directory->get(), container,
                              ZORGlobalConfiguration::ownerOfClassDirectory(address.containerClass, address.userId)))

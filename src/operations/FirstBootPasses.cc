@@ -85,7 +85,7 @@ bool FirstBootPasses::migrateGroupIdentifiers(const ZORMetadata& container) {
     const plist::Dictionary migrated{{std::string(entitlementKeys::applicationGroups), groups}};
     ZOR_LOG(needs_.log, logLevelDebug, "Data container for userId: %u, identifier %s references container IDs: %s",
             needs_.configuration.users().first, ZOR_SHOWN(identifier), plist::describe(&groups).c_str());
-    // Whoever registered meanwhile did so under this system: what it said stays, and the older list is added.
+    // A client that registered meanwhile did so under this system: what it said stays, and the older list is added.
     const auto stored = needs_.entitlements.uniteEntitlements(identifier, migrated);
     if (!stored) {
         needs_.log.write(logLevelError, migrateFunction, "Failed to write group id entitlements for %s to file : %s",
@@ -107,7 +107,7 @@ bool FirstBootPasses::migrateGroupIdentifiers(const ZORMetadata& container) {
 }
 
 std::optional<std::set<std::string, std::less<>>> FirstBootPasses::ownersOfSystemContainers() {
-    // What was lost with the file is not known to be unentitled.
+    // An identifier that was lost with the file is not known to be unentitled.
     if (const auto lost = needs_.entitlements.lostFile()) {
         const ZORError error = posixError({reconcileFunction, __LINE__}, EIO,
                                           "the entitlement file could not be read and lies at %s", lost->c_str());

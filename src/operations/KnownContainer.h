@@ -23,7 +23,7 @@ struct ContainerAddress {
     std::optional<std::string> identifier;
     ContainerClass containerClass = ContainerClass::undefined;
 
-    /// Of an address that has been checked.
+    /// The container of an address that has been checked.
     [[nodiscard]] std::string lockName() const { return uuid->string(); }
 };
 

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What an operation that moved containers does before it answers: the moves are to be on the disk.
+// The last step of an operation that moved containers, before it answers: the moves are to be on the disk.
 //
 // Syncs run without locks wherever that can be. One that fails leaves what was moved in its new place, and the answer
 // says that a power cut may undo it. Any thread.
@@ -24,7 +24,7 @@ public:
 
     /// Makes what was moved into or out of these directories durable; the error is not logged.
     [[nodiscard]] std::optional<ZORError> syncDirectories(std::vector<FileURL> changed) const;
-    /// What was changed in one directory is on the disk before what comes in the other can be. 0 or a negative errno.
+    /// A change in one directory is on the disk before the next one in the other can be. 0 or a negative errno.
     [[nodiscard]] int orderBetween(const FileURL& changed, const FileURL& next) const;
     /// The error of a container whose move into its place could not be synced, logged. The record says so until one is.
     [[nodiscard]] ZORError notLasting(const char* function, ErrorCode code, const FileURL& container,

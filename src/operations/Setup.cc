@@ -176,7 +176,7 @@ void Setup::containerManagerSetup() {
     report.run("dangling mappings", [this] { return removeDanglingMappings(); });
     // Files that are acknowledged one by one later lie in directories that must not go with the power.
     makeDirectoriesDurable();
-    // What the boot's passes read is older than what they cleaned up afterwards.
+    // The records that the boot's passes read are older than their clean-up.
     needs_.cache.dropAll();
 }
 

@@ -39,7 +39,7 @@ public:
         platform::TerminationAssertionService& assertions;
         const StoreLimits& limits;
         InfoValues& infoValues;
-        /// What each change needs.
+        /// The services that each change needs.
         ZORDataProtectionChangeOperation::Needs change;
     };
     struct Request {

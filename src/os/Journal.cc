@@ -25,8 +25,8 @@ void addField(std::string& entry, std::string_view name, std::string_view value)
     entry += '\n';
 }
 
-/// What a healthy device does all day is no error there, whatever its level in the log file: that a client asked for
-/// what is not there, or for what it may not have.
+/// The work that a healthy device does all day is no error there, whatever its level in the log file: that a client
+/// asked for what is not there, or for what it may not have.
 int priorityOf(int level, const LogSubject& subject) {
     if (level != LOG_ERR)
         return level;

@@ -14,7 +14,7 @@
 
 namespace zor::platform {
 
-/// What a log line says of itself, and of the request that it belongs to.
+/// The fields of a log line, and of the request that it belongs to.
 struct JournalLine {
     int level = 0;
     std::string_view function;

@@ -31,7 +31,7 @@ class RotatingLog final : public PlatformLog {
 public:
     /// `yes`: every line also goes to standard error.
     enum class Foreground { no, yes };
-    /// What the journal takes is not written to standard error, which it would read, too.
+    /// A line that the journal takes is not written to standard error, which it would read, too.
     explicit RotatingLog(Foreground foreground, int standardError = 2)
         : RotatingLog(foreground, standardError, Journal::ofEnvironment(standardError)) {}
     RotatingLog(Foreground foreground, int standardError, Journal journal);

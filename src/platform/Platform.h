@@ -18,7 +18,7 @@ class SystemRoot;
 /// References to objects that outlive whoever holds this.
 struct Platform {
     const SystemRoot& root;
-    /// Who owns containers on that root.
+    /// The owners of containers on that root.
     ipc::UserNumbers users;
     Disk& disk;
     PlatformLog& log;

@@ -21,7 +21,7 @@ struct ListenerLimits {
     /// These limits where others own containers: more users have more threads, each of them its share.
     [[nodiscard]] ListenerLimits forUsers(const ipc::UserNumbers& owners) const;
 
-    /// Who has a share of its own; all others have one together.
+    /// The users that have a share of their own; all others have one together.
     ipc::UserNumbers users;
 
     /// Connections in all, and of any one user that does not own the root.

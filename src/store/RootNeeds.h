@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// What a system root has to hold before a daemon can serve it, and which the daemon does not make: it belongs to
-// whoever builds the device. Immutable; any thread.
+// The things that a system root has to hold before a daemon can serve it, and which the daemon does not make: it
+// belongs to whoever builds the device. Immutable; any thread.
 #pragma once
 
 #include "os/SystemRoot.h"

@@ -21,7 +21,7 @@ namespace {
 constexpr const char* processFunction = "_onQueue_processEntitlements";
 constexpr const char* setFunction = "_setEntitlementDictionaryValues";
 
-/// What is stored under the map's own keys is the daemon's; anything else there counts as nothing.
+/// The content under the map's own keys is the daemon's; anything else there counts as nothing.
 plist::Dictionary copyOf(const plist::Dictionary* dictionary) {
     return dictionary ? *dictionary : plist::Dictionary();
 }

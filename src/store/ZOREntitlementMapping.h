@@ -48,7 +48,7 @@ public:
     /// Without those that do not begin with "systemgroup.".
     [[nodiscard]] Identifiers systemGroupIdentifiersForIdentifier(std::string_view identifier)
         ZOR_EXCLUDES(entitlementQueue_);
-    /// Who refers to which group.
+    /// The identifiers that refer to each group.
     [[nodiscard]] GroupReferences groupReferences(GroupType type) ZOR_EXCLUDES(entitlementQueue_);
     /// The children recorded for an identifier.
     [[nodiscard]] std::vector<std::string> childrenOf(const std::string& identifier) ZOR_EXCLUDES(entitlementQueue_);
@@ -142,7 +142,7 @@ private:
                                     SayStaging say) const ZOR_REQUIRES(entitlementQueue_);
     void _onQueue_stageFlag(Plan& plan, std::string_view key, const std::string& identifier,
                             const plist::Dictionary* options) const ZOR_REQUIRES(entitlementQueue_);
-    /// What goes with the old entitlements.
+    /// The containers that go with the old entitlements.
     void _onQueue_stageReleases(Plan& plan, const plist::Dictionary* entitlements, const std::string& identifier) const
         ZOR_REQUIRES(entitlementQueue_);
     [[nodiscard]] bool _onQueue_changesNothing(const plist::Dictionary* entitlements, const std::string& identifier,

@@ -34,7 +34,7 @@ public:
     ZORGlobalConfiguration(const Log& log, ZORFileManager& fileManager, const platform::PasswordDatabase& passwords,
                            const UserNumbers& users);
 
-    /// Who owns containers; never changed.
+    /// The owners of containers; never changed.
     [[nodiscard]] const UserNumbers& users() const { return users_; }
 
     /// The user's configuration, made at the first call; nullptr for who is none (tried and logged again each time).

@@ -20,7 +20,7 @@ struct Place {
     /// Words that were neither commands nor options.
     std::size_t positionals = 0;
     bool optionsHaveEnded = false;
-    /// What options were given, by their long names without dashes.
+    /// The options that were given, by their long names without dashes.
     std::map<std::string, std::string> values;
     /// What is wrong with the first word that is known nowhere, with the nearest one that is.
     std::optional<std::string> mistake;

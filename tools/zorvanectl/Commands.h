@@ -144,7 +144,7 @@ int systemGroupPath(const zorvane::ConnectOptions& connect, const Output& output
                     const std::string& identifier);
 /// Who holds the groups of an identifier, and what goes when it goes.
 int why(const zorvane::ConnectOptions& connect, const Output& output, const std::string& identifier);
-/// Who holds a group, application's or system's.
+/// The holders of a group, application's or system's.
 int whyGroup(const zorvane::ConnectOptions& connect, const Output& output, const std::string& group);
 
 } // namespace zorvanectl

@@ -12,7 +12,7 @@ namespace zorvanectl {
 
 struct FoundContainer {
     zorvane::Client::Address address;
-    /// Where they were asked for.
+    /// The place where they were asked for.
     std::string path;
     std::uint64_t bytes = 0;
 };

@@ -61,7 +61,7 @@ std::string registryEntry(const std::string& identifier, const std::string& exec
            "</dict>\n</plist>\n";
 }
 
-/// What XML gives a meaning to, in a path.
+/// The characters of a path that mean something in XML.
 bool isPlainPath(const std::string& path) {
     return path.find_first_of("<>&") == path.npos;
 }

@@ -17,7 +17,7 @@ namespace zorvanectl {
 struct LostRecord {
     /// Where one is recorded that a new container does not have.
     std::optional<std::int32_t> protectionClass;
-    /// Of info values that were set by somebody.
+    /// The keys of info values that were set by somebody.
     std::vector<std::string> infoKeys;
 };
 /// Nothing of a record that cannot be read.

@@ -16,7 +16,7 @@ namespace zorvanectl {
 
 // Exit codes; they do not change.
 inline constexpr int exitDone = 0;
-/// What was named is not there.
+/// A thing that was named is not there.
 inline constexpr int exitNotFound = 1;
 inline constexpr int exitUsage = 2;
 inline constexpr int exitUnreachable = 3;
@@ -31,8 +31,8 @@ inline constexpr int exitOutputLost = 8;
 /// The daemon answered with another error, or with what makes no sense.
 inline constexpr int exitDaemonError = 9;
 
-/// Of every JSON document, as "version". A key may come with the same number; one that goes or means something else
-/// raises it.
+/// The version of every JSON document, as "version". A key may come with the same number; one that goes or means
+/// something else raises it.
 inline constexpr int jsonVersion = 1;
 
 enum class Format { people, json };

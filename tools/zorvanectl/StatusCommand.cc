@@ -27,7 +27,7 @@ struct DiskSpace {
     std::uint64_t bytes = 0;
 };
 
-/// What the daemon does not tell; nothing where it cannot be seen from here.
+/// The part that the daemon does not tell; nothing where it cannot be seen from here.
 struct Surroundings {
     std::optional<std::size_t> containers;
     std::optional<zor::check::DeathRow> deathRow;

@@ -29,7 +29,7 @@ struct Error {
     std::uint64_t code = 0;
     /// One sentence for people, without a full stop.
     std::string message;
-    /// What to do, in the same form; empty where kind and code say it all (errorText).
+    /// The advice, in the same form; empty where kind and code say it all (errorText).
     std::string advice = {};
 };
 

@@ -10,7 +10,7 @@ namespace zorvanectl::content {
 struct Failure {
     /// Without a full stop; names in it are printable.
     std::string what;
-    /// What to do, where trying again does not help. Lives for ever.
+    /// The advice, where trying again does not help. Lives for ever.
     const char* advice = "";
 };
 
@@ -20,7 +20,7 @@ using Outcome = std::expected<T, Failure>;
 /// "WHAT: what the errno means".
 [[nodiscard]] std::unexpected<Failure> failed(const std::string& what, int number);
 [[nodiscard]] std::unexpected<Failure> failed(std::string what);
-/// What is to be installed is not taken as it is.
+/// The source of an installation is not taken as it is.
 [[nodiscard]] std::unexpected<Failure> refused(std::string what);
 /// The file system is too full for it.
 [[nodiscard]] std::unexpected<Failure> lacksRoom(std::string what);
