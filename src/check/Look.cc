@@ -21,7 +21,7 @@ Look::Look(CheckedSystem& system, const CheckOptions& options)
 
 void Look::addUser(std::uint32_t userId) {
     const auto entry = system_.passwords().entryForUserId(userId);
-    fs::BoundedQuestion wayToHome;
+    HomeQuestion wayToHome;
     auto home = UserHome::pathOf(system_.passwords(), userId, wayToHome);
     const FileURL looked = entry ? FileURL::directory(home ? home->path() : entry->homeDirectory)
                                  : FileURL::file(system_.root().path(platform::names::passwordFile));

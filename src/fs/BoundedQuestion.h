@@ -1,39 +1,82 @@
 // SPDX-License-Identifier: Apache-2.0
 // A question to a file system that may never answer, asked on a thread of its own so that nobody else waits for ever.
 //
-// One question at a time for an object: while one has not come back, others are told so at once. So a file system that
-// is dead costs one thread, however often it is asked about. The thread holds nothing but what the question brings
-// along, which has to outlive nothing: it may still wait when the process ends.
+// One question at a time for an object: who comes while one is under way gets the answer to that, and while one has not
+// come back, others are told so at once. So a file system that is dead costs one thread, however often it is asked
+// about. The thread holds nothing but what the question brings along, which has to outlive nothing: it may still wait
+// when the process ends.
 #pragma once
 
+#include "base/BlockingScope.h"
 #include "base/Mutex.h"
 
 #include <chrono>
+#include <cstdint>
 #include <functional>
 #include <memory>
+#include <optional>
+#include <system_error>
+#include <thread>
 
 namespace zor::fs {
 
+/// All questions of an object are the same one, so that one's answer is as good as another's.
+template <typename Answer>
 class BoundedQuestion {
 public:
-    BoundedQuestion() : state_(std::make_shared<State>()) {}
-
-    /// Runs `question` on another thread and waits for its end up to `patience`; who finds another one's question under
-    /// way waits for that, unless somebody has already waited in vain. False: it has not come back. Any thread.
-    bool ask(std::function<void()> question, std::chrono::milliseconds patience);
+    /// Runs `question` on another thread, or waits for the one that is under way unless somebody has already waited in
+    /// vain. None: it has not come back within `patience`, or no thread could be had. Any thread.
+    std::optional<Answer> ask(std::function<Answer()> question, std::chrono::milliseconds patience) {
+        State& state = *state_;
+        const platform::BlockingScope blocking;
+        const platform::MutexLock held(state.mutex);
+        if (state.late || (!state.underWay && !begin(std::move(question))))
+            return std::nullopt;
+        const std::uint64_t answersBefore = state.answers;
+        const auto until = std::chrono::steady_clock::now() + patience;
+        while (state.answers == answersBefore) {
+            const auto left = until - std::chrono::steady_clock::now();
+            if (left <= left.zero()) {
+                state.late = true;
+                return std::nullopt;
+            }
+            state.ended.waitFor(state.mutex, std::chrono::duration_cast<std::chrono::milliseconds>(left) +
+                                                 std::chrono::milliseconds(1));
+        }
+        return state.answer;
+    }
 
 private:
     struct State {
         platform::Mutex mutex;
         platform::ConditionVariable ended;
-        std::uint64_t begun ZOR_GUARDED_BY(mutex) = 0;
-        std::uint64_t done ZOR_GUARDED_BY(mutex) = 0;
+        bool underWay ZOR_GUARDED_BY(mutex) = false;
         /// Somebody gave up waiting for the question that is under way.
         bool late ZOR_GUARDED_BY(mutex) = false;
+        std::uint64_t answers ZOR_GUARDED_BY(mutex) = 0;
+        std::optional<Answer> answer ZOR_GUARDED_BY(mutex);
     };
-    static bool begin(const std::shared_ptr<State>& state, std::function<void()> question);
 
-    const std::shared_ptr<State> state_;
+    bool begin(std::function<Answer()> question) ZOR_REQUIRES(state_->mutex) {
+        try {
+            std::thread([state = state_, question = std::move(question)]() mutable {
+                Answer answer = question();
+                question = nullptr; // who waits finds nothing held any more by what was asked
+                const platform::MutexLock held(state->mutex);
+                state->answer = std::move(answer);
+                ++state->answers;
+                state->underWay = state->late = false;
+                state->ended.broadcast();
+            }).detach();
+            state_->underWay = true;
+            return true;
+        } catch (const std::system_error&) {
+            // No thread can be had now: that the file system answers is not known, and is not taken for granted.
+            return false;
+        }
+    }
+
+    const std::shared_ptr<State> state_ = std::make_shared<State>();
 };
 
 } // namespace zor::fs

@@ -113,13 +113,14 @@ MountKind MountFence::Judgement::judge(int home) {
     return judged;
 }
 
-void MountFence::Judgement::ask() {
+MountFence::Answered MountFence::Judgement::ask() {
     const auto home = openBeneath(ownRoot.get(), path.c_str(), pathFlags);
     struct statx answer{};
     if (home && judge(home->get()) == MountKind::mayHang)
         (void)::statx(home->get(), "", AT_EMPTY_PATH | AT_STATX_FORCE_SYNC, STATX_BASIC_STATS, &answer);
     const MutexLock held(mutex);
     answeredAt = std::chrono::steady_clock::now();
+    return {};
 }
 
 bool MountFence::answers() {
@@ -134,7 +135,7 @@ bool MountFence::answers() {
         if (!judgement_->ownRoot.valid())
             judgement_->ownRoot.reset(::fcntl(judgement_->root, F_DUPFD_CLOEXEC, 0));
     }
-    return question_.ask([judgement = judgement_] { judgement->ask(); }, homePatience);
+    return question_.ask([judgement = judgement_] { return judgement->ask(); }, homePatience).has_value();
 }
 
 OpenResult MountFence::openOwn(const char* path, std::size_t ownBytes) {

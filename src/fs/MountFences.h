@@ -70,6 +70,7 @@ public:
     [[nodiscard]] int status(const char* path, struct stat& status);
 
 private:
+    struct Answered {};
     /// Shared with a question that may not come back.
     struct Judgement {
         int root = -1;
@@ -82,14 +83,14 @@ private:
 
         /// Judges the mount of the home that is open, unless it is the one that was judged last.
         MountKind judge(int home) ZOR_EXCLUDES(mutex);
-        void ask() ZOR_EXCLUDES(mutex);
+        Answered ask() ZOR_EXCLUDES(mutex);
     };
     [[nodiscard]] OpenResult openOwn(const char* path, std::size_t ownBytes);
     [[nodiscard]] int rememberedStatus(const char* path, struct stat& status);
 
     const Kind kind_;
     const std::shared_ptr<Judgement> judgement_;
-    BoundedQuestion question_;
+    BoundedQuestion<Answered> question_;
 };
 
 class MountFences {

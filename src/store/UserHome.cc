@@ -20,31 +20,27 @@ namespace {
 /// How long a home that was there is taken to be there still by who only reads what is cached.
 constexpr std::int64_t lookEveryMilliseconds = 1000;
 
-std::expected<FileURL, int> resolved(const platform::PasswordEntry& entry, fs::BoundedQuestion& question) {
+std::expected<FileURL, int> resolved(const platform::PasswordEntry& entry, HomeQuestion& question) {
     // A home may be reached through links that its administrator made; below it, none is followed.
-    struct Answer {
-        std::string path;
-        int error = 0;
-    };
-    const auto answer = std::make_shared<Answer>();
-    const bool came = question.ask(
-        [answer, home = entry.homeDirectory] {
-            char path[PATH_MAX];
-            if (::realpath(home.c_str(), path))
-                answer->path = path;
-            else
-                answer->error = errno;
+    const auto path = question.ask(
+        [home = entry.homeDirectory]() -> std::expected<std::string, int> {
+            char whole[PATH_MAX];
+            if (!::realpath(home.c_str(), whole))
+                return std::unexpected(errno);
+            return whole;
         },
         fs::homePatience);
-    if (!came || answer->error != 0)
-        return std::unexpected(came ? answer->error : EHOSTDOWN);
-    return FileURL::directory(answer->path);
+    if (!path)
+        return std::unexpected(EHOSTDOWN);
+    if (!*path)
+        return std::unexpected(path->error());
+    return FileURL::directory(**path);
 }
 
 } // namespace
 
 std::expected<FileURL, int> UserHome::pathOf(const platform::PasswordDatabase& passwords, std::uint32_t userId,
-                                             fs::BoundedQuestion& question) {
+                                             HomeQuestion& question) {
     const auto entry = passwords.entryForUserId(userId);
     if (!entry)
         return std::unexpected(entry.error());

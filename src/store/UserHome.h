@@ -20,8 +20,12 @@
 #include <cstdint>
 #include <expected>
 #include <memory>
+#include <string>
 
 namespace zor {
+
+/// Leads to a home's path without links, or to an errno.
+using HomeQuestion = fs::BoundedQuestion<std::expected<std::string, int>>;
 
 class UserHome {
 public:
@@ -55,7 +59,7 @@ public:
     /// The home that the password database names, without links; the errno when it names none, or one that is not
     /// there; EHOSTDOWN when what the way to it lies on does not answer. `question` is one for each user.
     [[nodiscard]] static std::expected<FileURL, int> pathOf(const platform::PasswordDatabase& passwords,
-                                                            std::uint32_t userId, fs::BoundedQuestion& question);
+                                                            std::uint32_t userId, HomeQuestion& question);
 
 private:
     struct Found {
@@ -71,7 +75,7 @@ private:
     const Log& log_;
     const fs::PathResolver& resolver_;
     const platform::PasswordDatabase& passwords_;
-    fs::BoundedQuestion wayToHome_;
+    HomeQuestion wayToHome_;
     std::atomic<std::uint64_t> generation_{0};
     platform::Mutex mutex_;
     Found found_ ZOR_GUARDED_BY(mutex_);

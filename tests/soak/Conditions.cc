@@ -35,7 +35,7 @@ zorvane::Client::Lookup lateLookup() {
 
 Conditions::Conditions(Session& session) : session_(session) {
     const std::string root = session.root();
-    std::ofstream(root + "/etc/passwd", std::ios::app) << "late:x:503:503::/private/var/late:/bin/sh\n";
+    std::ofstream(root + "/etc/passwd", std::ios::app) << "late:x:504:504::/private/var/late:/bin/sh\n";
     files::create_directories(home());
     if (::geteuid() == 0)
         (void)!::chown(home().c_str(), lateUser, lateUser);

@@ -7,7 +7,7 @@
 
 namespace zor::soak {
 
-inline constexpr std::uint32_t lateUser = 503;
+inline constexpr std::uint32_t lateUser = 504;
 
 class Conditions {
 public:

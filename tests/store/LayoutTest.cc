@@ -30,5 +30,24 @@ TEST(Layout, LinksToAndBelowAHome) {
     EXPECT_TRUE(world.names("private/var/second").empty());
 }
 
+// Goal: who first asks for a home while another does is given that home. Method: threads, all at once, many times.
+TEST(Layout, FirstLooksThatMeetSeeOneHome) {
+    World world;
+    Composition& services = world.services();
+    for (int round = 0; round < 200; ++round) {
+        UserHome home(mobile, services.log(), services.defaultManager().resolver(), services.platform().passwords);
+        std::atomic<int> wrong{0};
+        std::vector<std::thread> threads;
+        for (int i = 0; i < 4; ++i)
+            threads.emplace_back([&] {
+                const auto seen = home.look();
+                wrong += !seen.directory || *seen.directory != world.url("private/var/mobile");
+            });
+        for (std::thread& thread : threads)
+            thread.join();
+        ASSERT_EQ(wrong, 0) << "in round " << round;
+    }
+}
+
 } // namespace
 } // namespace zor::test
