@@ -24,7 +24,12 @@ Error error(Error::Kind kind, std::string message, std::string advice) {
     return {.kind = kind, .code = 0, .message = std::move(message), .advice = std::move(advice)};
 }
 
-constexpr const char* endedWithoutAnswer = "zorvaned ended the connection without an answer";
+/// Appends: at -O2 gcc 12 takes a sum of such texts for an overflow.
+std::string endedWithoutAnswer(std::string_view more) {
+    std::string text = "zorvaned ended the connection without an answer, ";
+    text += more;
+    return text;
+}
 
 /// Whether the file that this process runs has been taken from its place, as an upgrade does.
 bool ownExecutableIsGone() {
@@ -60,8 +65,7 @@ Error whyKnownButRefused(const plist::Dictionary& status, const plist::Dictionar
         return error(Error::Kind::unreachable, "zorvaned ended while the call waited, and has been started again",
                      "ask again; what the call was to change may have been done or not");
     return error(Error::Kind::refused,
-                 std::string(endedWithoutAnswer) + ", though it knows this program" + name +
-                     " and lets it send every command",
+                 endedWithoutAnswer("though it knows this program" + name + " and lets it send every command"),
                  "look into the daemon's log (zorvaned.log): a request that is no valid one, or too many connections, "
                  "are said there");
 }
@@ -97,8 +101,7 @@ Error whyEnded(const ConnectOptions& options, std::chrono::milliseconds age) {
             break;
         std::this_thread::sleep_for(std::chrono::milliseconds(10));
     }
-    return error(Error::Kind::refused,
-                 std::string(endedWithoutAnswer) + ", and does not tell whom it takes this program for",
+    return error(Error::Kind::refused, endedWithoutAnswer("and does not tell whom it takes this program for"),
                  "see 'zorvanectl status', and the daemon's log (zorvaned.log)");
 }
 
