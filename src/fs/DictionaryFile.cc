@@ -12,20 +12,25 @@
 
 namespace zor {
 
+Result<plist::Data> serialisedFor(const FileURL& url, const plist::Dictionary& dictionary, std::size_t bytesMax) {
+    plist::Data bytes;
+    if (const auto done = plist::appendBinary(dictionary, bytes); !done)
+        return posixError(ZOR_HERE, EINVAL, "serialisation for %s failed: %s", url.c_str(), done.error().reason);
+    if (bytes.size() > bytesMax)
+        return posixError(ZOR_HERE, EFBIG, "write of %s failed: %zu bytes are more than the %zu that it may have",
+                          url.c_str(), bytes.size(), bytesMax);
+    return bytes;
+}
+
 Result<void> writeToURL(const plist::Dictionary& dictionary, const FileURL& url, std::uint32_t options,
                         std::size_t bytesMax, ZORFileManager& fileManager) {
     if (options != (writeAtomically | writeWithoutProtection))
         return posixError(ZOR_HERE, EINVAL, "write of %s failed: options 0x%x are not offered", url.c_str(), options);
-    const auto bytes = plist::writeBinary(dictionary);
-    if (!bytes)
-        return posixError(ZOR_HERE, EINVAL, "serialisation for %s failed: %s", url.c_str(), bytes.error().reason);
-    if (bytes->size() > bytesMax)
-        return posixError(ZOR_HERE, EFBIG, "write of %s failed: %zu bytes are more than the %zu that it may have",
-                          url.c_str(), bytes->size(), bytesMax);
+    const plist::Data bytes = TRY(serialisedFor(url, dictionary, bytesMax));
     const auto parent = fileManager.resolver().openParent(url);
     const int status =
         parent ? fs::replaceFileDurably(
-                     fileManager.disk(), parent->directory.get(), parent->name, 0644, *bytes,
+                     fileManager.disk(), parent->directory.get(), parent->name, 0644, bytes,
                      [&](int file) { return -fileManager.setClassAtCreation(file, classWithoutProtection); })
                : -parent.error();
     if (status < 0)

@@ -18,6 +18,9 @@ inline constexpr std::uint32_t writeWithoutProtection = 0x10000000;
 /// The data-protection class of what is written without protection: it can be read while the device is locked.
 inline constexpr int classWithoutProtection = 4;
 
+/// The bytes of the file that `url` is to be, in messages. EFBIG for more than `bytesMax`.
+Result<plist::Data> serialisedFor(const FileURL& url, const plist::Dictionary& dictionary, std::size_t bytesMax);
+
 /// Serialises as a binary property list and writes it, 0644 and the daemon's own; POSIX error with the previous file
 /// untouched. Both options are what every caller wants; others are not offered. EFBIG, before anything is written, for
 /// more than `bytesMax`: what a reader would refuse must not replace what it accepts.

@@ -19,24 +19,18 @@ Result<void> ContainerRemoval::stage(const ContainerToGo& container) {
         std::vector<FileURL> changed;
         auto staged = [&] {
             const AllIdentifiersWriteLock lock(needs_.locks);
-            return findAndTake(container, changed, lock);
+            return stage(container, changed, lock);
         }();
         return conclude(std::move(staged), std::move(changed));
     });
 }
 
-Result<void> ContainerRemoval::stage(const ContainerToGo& container, const AllIdentifiersWriteLock& lock) {
+Result<void> ContainerRemoval::stage(const ContainerToGo& container, std::vector<FileURL>& changed,
+                                     const AllIdentifiersWriteLock& lock) {
     return needs_.boundary.run({function, __LINE__}, [&]() -> Result<void> {
-        std::vector<FileURL> changed;
-        auto staged = findAndTake(container, changed, lock);
-        return conclude(std::move(staged), std::move(changed));
+        const auto record = TRY(find(container, lock));
+        return record ? take(container, *record, changed, lock) : Result<void>();
     });
-}
-
-Result<void> ContainerRemoval::findAndTake(const ContainerToGo& container, std::vector<FileURL>& changed,
-                                           const AllIdentifiersWriteLock& lock) {
-    const auto record = TRY(find(container, lock));
-    return record ? take(container, *record, changed, lock) : Result<void>();
 }
 
 Result<std::shared_ptr<ZORMetadata>> ContainerRemoval::find(const ContainerToGo& container,

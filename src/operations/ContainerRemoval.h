@@ -54,7 +54,10 @@ public:
     /// Stages one container for deletion; one that is not there is skipped. Errors 28 (not durable), 35 (another may
     /// come back in its place), 44 (it could not be looked for), 46, 40.
     Result<void> stage(const ContainerToGo& container);
-    Result<void> stage(const ContainerToGo& container, const AllIdentifiersWriteLock& lock);
+    /// The same for who holds the lock: `changed` gets the directories to be synced when it is released, before anybody
+    /// is told (conclude).
+    Result<void> stage(const ContainerToGo& container, std::vector<FileURL>& changed,
+                       const AllIdentifiersWriteLock& lock);
 
     // The steps of it, for who stages several.
     /// The record; nullptr when there is none.
@@ -62,13 +65,10 @@ public:
     /// `changed` gets the directories to be synced.
     Result<void> take(const ContainerToGo& container, const ZORMetadata& record, std::vector<FileURL>& changed,
                       const AllIdentifiersWriteLock& lock);
-    /// Everything that has been taken is on the disk, whatever `staged` says of the rest. Without a lock where that can
-    /// be.
+    /// Everything that has been taken is on the disk, whatever `staged` says of the rest. Without a lock.
     Result<void> conclude(Result<void> staged, std::vector<FileURL> changed);
 
 private:
-    Result<void> findAndTake(const ContainerToGo& container, std::vector<FileURL>& changed,
-                             const AllIdentifiersWriteLock& lock);
     /// False, logged, when the container stays where it is. `owner` as DeathRow::condemn has it.
     bool takeAway(const FileURL& container, std::optional<std::uint32_t> owner, std::vector<FileURL>& changed);
 

@@ -27,6 +27,18 @@ DeletionBatch DeletionBatch::of(std::uint32_t userId, const UUID& uuid, const st
             .classes = {static_cast<std::uint64_t>(containerClass)}};
 }
 
+/// How far a batch has come.
+struct Deletion::Progress {
+    /// The element that is next.
+    std::size_t next = 0;
+    /// The element whose registration has been released; it does not wait for another one that comes meanwhile.
+    std::optional<std::size_t> released;
+    /// The change that releases it, for which it waits.
+    std::optional<EntitlementChange::Change> unsettled;
+    std::vector<FileURL> changed; // to be synced
+    Result<void> first;           // the first error that stops no other
+};
+
 Result<void> Deletion::stageForDeleteContainersWithUsers(const DeletionBatch& batch) {
     return needs_.boundary.run({stageFunction, __LINE__}, [&]() -> Result<void> {
         const std::size_t count = batch.uuids.size();
@@ -35,26 +47,38 @@ Result<void> Deletion::stageForDeleteContainersWithUsers(const DeletionBatch& ba
                              "Can't act on an invalid input: UUIDString count: %ld, class count: %ld, ID count: %ld",
                              static_cast<long>(count), static_cast<long>(batch.classes.size()),
                              static_cast<long>(batch.identifiers.size()));
-        std::vector<FileURL> changed;
-        auto staged = [&]() -> Result<void> {
-            const AllIdentifiersWriteLock lock(needs_.locks);
-            Result<void> first;
-            for (std::size_t index = 0; index < count; ++index) {
-                auto one = stageForDelete(batch, index, changed, lock);
-                // A container that could not be looked for, or has to stay, keeps no other from going.
-                if (!one && !one.error().isOwnShortage() && !one.error().is(ErrorCode::journalUnusable))
-                    return one;
-                if (!one && first)
-                    first = std::move(one);
-            }
-            return first;
-        }();
-        return needs_.removal.conclude(std::move(staged), std::move(changed));
+        Progress progress;
+        while (progress.next < count) {
+            auto staged = [&] {
+                const AllIdentifiersWriteLock lock(needs_.locks);
+                return stageNext(batch, progress, lock);
+            }();
+            if (!staged)
+                return needs_.removal.conclude(std::move(staged), std::move(progress.changed));
+            if (const auto change = std::exchange(progress.unsettled, std::nullopt))
+                needs_.entitlementChange.settleRemoval(*batch.identifiers[progress.next], *change);
+        }
+        return needs_.removal.conclude(std::move(progress.first), std::move(progress.changed));
     });
 }
 
-Result<void> Deletion::stageForDelete(const DeletionBatch& batch, std::size_t index, std::vector<FileURL>& changed,
+Result<void> Deletion::stageNext(const DeletionBatch& batch, Progress& progress, const AllIdentifiersWriteLock& lock) {
+    for (; progress.next < batch.uuids.size(); ++progress.next) {
+        auto one = stageForDelete(batch, progress, lock);
+        if (progress.unsettled)
+            return {};
+        // A container that could not be looked for, or has to stay, keeps no other from going.
+        if (!one && !one.error().isOwnShortage() && !one.error().is(ErrorCode::journalUnusable))
+            return one;
+        if (!one && progress.first)
+            progress.first = std::move(one);
+    }
+    return {};
+}
+
+Result<void> Deletion::stageForDelete(const DeletionBatch& batch, Progress& progress,
                                       const AllIdentifiersWriteLock& lock) {
+    const std::size_t index = progress.next;
     const std::uint32_t userId = userAt(batch.users, index);
     if (!batch.classes[index]) {
         makeError(needs_.log, {stageFunction, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
@@ -76,9 +100,14 @@ Result<void> Deletion::stageForDelete(const DeletionBatch& batch, std::size_t in
     if (!record)
         return {};
     // The purpose of a transient one may not come to be: what is registered is still the live one's.
-    if (isBundleClass(containerClass) && !record->transient())
-        needs_.entitlementChange.removeEntitlementDictionariesForIdentifierAndItsChildren(*identifier, lock);
-    return needs_.removal.take(container, *record, changed, lock);
+    if (isBundleClass(containerClass) && !record->transient() && progress.released != index) {
+        progress.released = index;
+        progress.unsettled =
+            needs_.entitlementChange.removeEntitlementDictionariesForIdentifierAndItsChildren(*identifier, lock);
+        if (progress.unsettled)
+            return {};
+    }
+    return needs_.removal.take(container, *record, progress.changed, lock);
 }
 
 Result<void> Deletion::deleteContainerForUser(const Caller& caller, std::uint32_t userId, const std::string* identifier,

@@ -2,9 +2,10 @@
 // Taking containers out of the store at a client's word: a whole batch, or the one of an identifier.
 //
 // A container leaves with one move to death row (ContainerRemoval); the slow removal comes with a later pass. A live
-// bundle takes along what is registered for it (EntitlementChange), first. What a stop leaves after that: the bundle
-// still there; deleting it again finds nothing more to drop. Elements of a batch are independent: a stop in the middle
-// has staged the first ones. Any thread.
+// bundle takes along what is registered for it (EntitlementChange), first: that is on the disk before the bundle moves,
+// so its deletion lets the lock go in between, and looks for the bundle again. What a stop leaves after that: the
+// bundle still there; deleting it again finds nothing more to drop. Elements of a batch are independent: a stop in the
+// middle has staged the first ones. Any thread.
 #pragma once
 
 #include "base/ContainerClass.h"
@@ -51,8 +52,8 @@ public:
     explicit Deletion(const Needs& needs) : needs_(needs) {}
 
     /// Takes the containers out of the store; their files go with the next deletion pass. What is not there is skipped,
-    /// what is malformed is logged and skipped. Runs under the all-identifiers lock held for writing. Only a live
-    /// bundle's deletion releases what is registered for it. Errors 11 (lists that do not agree), and those of
+    /// what is malformed is logged and skipped. Takes the all-identifiers lock for writing, and syncs without it. Only
+    /// a live bundle's deletion releases what is registered for it. Errors 11 (lists that do not agree), and those of
     /// ContainerRemoval.
     Result<void> stageForDeleteContainersWithUsers(const DeletionBatch& batch);
     /// Stages the one container of an identifier. Errors as the lookup's and the staging's.
@@ -60,9 +61,10 @@ public:
                                         ContainerClass containerClass, bool transient);
 
 private:
-    /// One element; `changed` gets the directories to be synced.
-    Result<void> stageForDelete(const DeletionBatch& batch, std::size_t index, std::vector<FileURL>& changed,
-                                const AllIdentifiersWriteLock& lock);
+    struct Progress;
+    /// The elements from the one on that is next, to the end, or to one whose entitlements have to be settled first.
+    Result<void> stageNext(const DeletionBatch& batch, Progress& progress, const AllIdentifiersWriteLock& lock);
+    Result<void> stageForDelete(const DeletionBatch& batch, Progress& progress, const AllIdentifiersWriteLock& lock);
 
     const Needs needs_;
 };

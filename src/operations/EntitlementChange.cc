@@ -7,6 +7,8 @@
 
 #include <algorithm>
 #include <exception>
+#include <iterator>
+#include <utility>
 
 namespace zor {
 
@@ -55,27 +57,56 @@ ErrorCode EntitlementChange::processEntitlements(const plist::Dictionary* entitl
         if (canBeProcessed(*identifier, options) &&
             needs_.entitlements.changesNothing(entitlements, *identifier, options))
             return ErrorCode::success;
-        const AllIdentifiersWriteLock lock(needs_.locks);
-        return process(entitlements, *identifier, options, lock);
+        std::optional<Change> change;
+        const ErrorCode code = [&] {
+            const AllIdentifiersWriteLock lock(needs_.locks);
+            return process(entitlements, *identifier, options, change, lock);
+        }();
+        return change ? settle(*change) : code;
     });
     return processed ? *processed : processed.error().replyCode();
 }
 
-void EntitlementChange::removeEntitlementDictionariesForIdentifierAndItsChildren(const std::string& identifier,
-                                                                                 const AllIdentifiersWriteLock& lock) {
+ErrorCode EntitlementChange::settle(Change change) {
+    const auto settled = needs_.entitlements.save(change, [&] {
+        std::vector<FileURL> changed;
+        {
+            const platform::MutexLock held(unsyncedMutex_);
+            changed.swap(unsynced_);
+        }
+        (void)needs_.removal.conclude({}, std::move(changed)); // it says so itself
+    });
+    return settled ? ErrorCode::success : settled.error().replyCode();
+}
+
+std::optional<EntitlementChange::Change>
+EntitlementChange::removeEntitlementDictionariesForIdentifierAndItsChildren(const std::string& identifier,
+                                                                            const AllIdentifiersWriteLock& lock) {
+    std::optional<Change> last;
     std::vector<std::string> all{identifier};
     std::ranges::move(needs_.entitlements.childrenOf(identifier), std::back_inserter(all));
     for (const std::string& one : all) {
-        const ErrorCode code = process(nullptr, one, nullptr, lock);
-        if (code != ErrorCode::success)
-            needs_.log.write(logLevelError, "_onQueue_removeEntitlementDictionariesForIdentifierAndItsChildren",
-                             "Failed to clear entitlements for %s : %llu", ZOR_SHOWN(one),
-                             static_cast<unsigned long long>(code));
+        std::optional<Change> change;
+        sayIfNotCleared(one, process(nullptr, one, nullptr, change, lock));
+        last = std::max(last, change);
     }
+    return last;
+}
+
+void EntitlementChange::settleRemoval(const std::string& identifier, Change change) {
+    sayIfNotCleared(identifier, settle(change));
+}
+
+void EntitlementChange::sayIfNotCleared(const std::string& identifier, ErrorCode code) const {
+    if (code != ErrorCode::success)
+        needs_.log.write(logLevelError, "_onQueue_removeEntitlementDictionariesForIdentifierAndItsChildren",
+                         "Failed to clear entitlements for %s : %llu", ZOR_SHOWN(identifier),
+                         static_cast<unsigned long long>(code));
 }
 
 ErrorCode EntitlementChange::process(const plist::Dictionary* entitlements, const std::string& identifier,
-                                     const plist::Dictionary* options, const AllIdentifiersWriteLock& lock) {
+                                     const plist::Dictionary* options, std::optional<Change>& change,
+                                     const AllIdentifiersWriteLock& lock) {
     try {
         if (!canBeProcessed(identifier, options))
             return makeError(needs_.log, {processFunction, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
@@ -86,26 +117,34 @@ ErrorCode EntitlementChange::process(const plist::Dictionary* entitlements, cons
             return makeError(needs_.log, {processFunction, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
                              "Can't act on an invalid object: ID: %s: %s", ZOR_SHOWN(identifier), why)
                 .replyCode();
-        const auto processed = planReleaseSettle(entitlements, identifier, options, lock);
-        return processed ? ErrorCode::success : processed.error().replyCode();
+        const auto applied = planReleaseApply(entitlements, identifier, options, lock);
+        if (applied)
+            change = *applied;
+        return applied ? ErrorCode::success : applied.error().replyCode();
     } catch (const std::exception& exception) {
         return needs_.boundary.caught({processFunction, __LINE__}, exception).replyCode();
     }
 }
 
-Result<void> EntitlementChange::planReleaseSettle(const plist::Dictionary* entitlements, const std::string& identifier,
-                                                  const plist::Dictionary* options,
-                                                  const AllIdentifiersWriteLock& lock) {
+Result<std::optional<EntitlementChange::Change>>
+EntitlementChange::planReleaseApply(const plist::Dictionary* entitlements, const std::string& identifier,
+                                    const plist::Dictionary* options, const AllIdentifiersWriteLock& lock) {
     const ZOREntitlementMapping::Plan plan = needs_.entitlements.plan(entitlements, identifier, options, lock);
+    std::vector<FileURL> changed;
     if (plan.releasesSystemContainer)
-        releaseSystemContainer(identifier, lock);
+        releaseSystemContainer(identifier, changed, lock);
     for (const auto& [type, before, after] : plan.groups)
         if (before)
-            needs_.groups.handleChangeFromOldGroupContainerIds(before, after, type, identifier, lock);
-    return needs_.entitlements.settle(plan, lock);
+            needs_.groups.handleChangeFromOldGroupContainerIds(before, after, type, identifier, changed, lock);
+    {
+        const platform::MutexLock held(unsyncedMutex_);
+        std::ranges::move(changed, std::back_inserter(unsynced_));
+    }
+    return needs_.entitlements.apply(plan, lock);
 }
 
-void EntitlementChange::releaseSystemContainer(const std::string& identifier, const AllIdentifiersWriteLock& lock) {
+void EntitlementChange::releaseSystemContainer(const std::string& identifier, std::vector<FileURL>& changed,
+                                               const AllIdentifiersWriteLock& lock) {
     const std::uint32_t user = needs_.configuration.users().system;
     const auto record = needs_.cache.containerForUser(user, ContainerClass::dataSystem, &identifier, false);
     if (!record) {
@@ -120,7 +159,7 @@ void EntitlementChange::releaseSystemContainer(const std::string& identifier, co
                                               .uuid = (*record)->uuid(),
                                               .identifier = identifier,
                                               .containerClass = (*record)->containerClass()},
-                                             lock);
+                                             changed, lock);
     if (!staged)
         needs_.log.write(logLevelError, processFunction, "Failed to destroy system container with identifier %s: %llu",
                          ZOR_SHOWN(identifier), static_cast<unsigned long long>(staged.error().replyCode()));

@@ -3,16 +3,18 @@
 //
 // A change is planned: the parts of the map that will differ, in the order in which they are stored, and what goes with
 // the old entitlements. Then the system container and the groups are released, while the map still holds those, so that
-// the last reference to a group still counts as one. Then the map is settled, and the file written once. A stop or a
-// failed save in between leaves containers on death row that the old map still speaks of: asked for again, they are
-// made anew.
+// the last reference to a group still counts as one. Then the change is applied to the map in memory. All that is under
+// the all-identifiers lock for writing, which nobody holds when the change is settled: the moves are synced, then the
+// file is written, once for all changes that wait for it. A stop or a failed save in between leaves containers on death
+// row that the old map still speaks of: asked for again, they are made anew.
 //
-// From the plan to the settling the all-identifiers lock is held for writing; nobody else changes the map then. The
-// entitlement queue is entered for the plan and for the settling alone: no disk work on containers stops its readers.
-// Any thread.
+// A change that another thread settles is settled with the moves that belong to it: a change leaves its moves here
+// before it is applied, and who settles takes all that were left before it syncs. Any thread.
 #pragma once
 
 #include "base/ErrorCode.h"
+#include "base/FileURL.h"
+#include "base/Mutex.h"
 #include "base/Result.h"
 #include "base/ZORException.h"
 #include "base/ZORLocks.h"
@@ -23,7 +25,9 @@
 #include "store/ZOREntitlementMapping.h"
 #include "store/ZORGlobalConfiguration.h"
 
+#include <optional>
 #include <string>
+#include <vector>
 
 namespace zor {
 
@@ -41,25 +45,39 @@ public:
     };
     explicit EntitlementChange(const Needs& needs) : needs_(needs) {}
 
-    /// Registers, changes or (`entitlements` nullptr) removes the entitlements of one identifier, under the
+    /// Registers, changes or (`entitlements` nullptr) removes the entitlements of one identifier, planned under the
     /// all-identifiers lock held for writing; what changes nothing takes neither that lock nor the disk. System and
     /// group containers that nothing refers to afterwards are staged for deletion. `options` may be nullptr.
     /// Codes: success; 18 without an identifier; 11 for an identifier that is a key of the map's own, or a parent that
     /// is no string; 59 when the file cannot be written; 40.
     ErrorCode processEntitlements(const plist::Dictionary* entitlements, const std::string* identifier,
                                   const plist::Dictionary* options);
-    /// Removes what is stored for an identifier and for the children recorded for it. Failures are logged.
-    void removeEntitlementDictionariesForIdentifierAndItsChildren(const std::string& identifier,
-                                                                  const AllIdentifiersWriteLock& lock);
+    using Change = ZOREntitlementMapping::Change;
+    /// Removes what is stored for an identifier and for the children recorded for it. The change that is to be settled
+    /// when the lock is released (settleRemoval); nullopt for none. Failures are logged.
+    std::optional<Change> removeEntitlementDictionariesForIdentifierAndItsChildren(const std::string& identifier,
+                                                                                   const AllIdentifiersWriteLock& lock);
+    /// Returns when that, and what it released, is on the disk. Without a lock. Failures are logged.
+    void settleRemoval(const std::string& identifier, Change change);
 
 private:
+    /// The same of any change. Code 59.
+    ErrorCode settle(Change change) ZOR_EXCLUDES(unsyncedMutex_);
+    void sayIfNotCleared(const std::string& identifier, ErrorCode code) const;
+    /// `change` gets what is to be settled, if anything is.
     ErrorCode process(const plist::Dictionary* entitlements, const std::string& identifier,
-                      const plist::Dictionary* options, const AllIdentifiersWriteLock& lock);
-    Result<void> planReleaseSettle(const plist::Dictionary* entitlements, const std::string& identifier,
-                                   const plist::Dictionary* options, const AllIdentifiersWriteLock& lock);
-    void releaseSystemContainer(const std::string& identifier, const AllIdentifiersWriteLock& lock);
+                      const plist::Dictionary* options, std::optional<Change>& change,
+                      const AllIdentifiersWriteLock& lock);
+    Result<std::optional<Change>> planReleaseApply(const plist::Dictionary* entitlements, const std::string& identifier,
+                                                   const plist::Dictionary* options,
+                                                   const AllIdentifiersWriteLock& lock);
+    void releaseSystemContainer(const std::string& identifier, std::vector<FileURL>& changed,
+                                const AllIdentifiersWriteLock& lock);
 
     const Needs needs_;
+    platform::Mutex unsyncedMutex_;
+    /// Directories whose changes are to be on the disk before the map is that no longer speaks of what left them.
+    std::vector<FileURL> unsynced_ ZOR_GUARDED_BY(unsyncedMutex_);
 };
 
 } // namespace zor

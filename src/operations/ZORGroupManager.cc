@@ -51,6 +51,7 @@ std::optional<ZORGroupManager::References> ZORGroupManager::_copyReferenceCountS
 
 void ZORGroupManager::handleChangeFromOldGroupContainerIds(Identifiers oldGroups, const Identifiers& newGroups,
                                                            GroupType type, const std::string& identifier,
+                                                           std::vector<FileURL>& changed,
                                                            const AllIdentifiersWriteLock& lock) {
     if (!oldGroups || oldGroups == newGroups)
         return;
@@ -58,11 +59,11 @@ void ZORGroupManager::handleChangeFromOldGroupContainerIds(Identifiers oldGroups
         std::erase_if(*oldGroups, [&](const std::string& group) {
             return std::ranges::find(*newGroups, group) != newGroups->end();
         });
-    _removeReferenceForGroupIdentifiers(*oldGroups, type, identifier, lock);
+    _removeReferenceForGroupIdentifiers(*oldGroups, type, identifier, changed, lock);
 }
 
 void ZORGroupManager::_removeReferenceForGroupIdentifiers(const std::vector<std::string>& groups, GroupType type,
-                                                          const std::string& identifier,
+                                                          const std::string& identifier, std::vector<FileURL>& changed,
                                                           const AllIdentifiersWriteLock& lock) {
     if (groups.empty())
         return;
@@ -74,13 +75,13 @@ void ZORGroupManager::_removeReferenceForGroupIdentifiers(const std::vector<std:
     }
     forEachUser(type, [&](std::uint32_t userId) {
         for (const std::string& group : groups)
-            _removeGroupContainersIfNeededforUser(userId, classOf(type), group, identifier, *references, lock);
+            _removeGroupContainersIfNeededforUser(userId, classOf(type), group, identifier, *references, changed, lock);
     });
 }
 
 void ZORGroupManager::_removeGroupContainersIfNeededforUser(std::uint32_t userId, ContainerClass containerClass,
                                                             const std::string& group, const std::string& identifier,
-                                                            const References& references,
+                                                            const References& references, std::vector<FileURL>& changed,
                                                             const AllIdentifiersWriteLock& lock) {
     const auto holders = references.find(group);
     const std::size_t count = holders == references.end() ? 0 : holders->second.size();
@@ -100,7 +101,7 @@ void ZORGroupManager::_removeGroupContainersIfNeededforUser(std::uint32_t userId
     needs_.log.write(logLevelNotice, __func__,
                      "Last reference to group container %s for %u is going away; removing it.", ZOR_SHOWN(group),
                      userId);
-    (void)isStaged(__func__, userId, **record, needs_.removal.stage(toGo(userId, **record), lock));
+    (void)isStaged(__func__, userId, **record, needs_.removal.stage(toGo(userId, **record), changed, lock));
 }
 
 bool ZORGroupManager::isStaged(const char* function, std::uint32_t userId, const ZORMetadata& record,

@@ -59,9 +59,10 @@ public:
                                                                       const std::string* identifier);
 
     /// Stages the containers of groups that lose their last reference by a change of `identifier` that has not been
-    /// settled: the map still holds what was before.
+    /// applied: the map still holds what was before. `changed` as ContainerRemoval::stage has it.
     void handleChangeFromOldGroupContainerIds(Identifiers oldGroups, const Identifiers& newGroups, GroupType type,
-                                              const std::string& identifier, const AllIdentifiersWriteLock& lock);
+                                              const std::string& identifier, std::vector<FileURL>& changed,
+                                              const AllIdentifiersWriteLock& lock);
     /// Stages every group container that the map does not refer to. At the boot, before clients are served.
     std::uint64_t reconcileGroupContainersOfType(GroupType type);
 
@@ -69,10 +70,12 @@ private:
     /// nullopt, logged, when the map is known to be incomplete.
     [[nodiscard]] std::optional<References> _copyReferenceCountSetOfType(GroupType type);
     void _removeReferenceForGroupIdentifiers(const std::vector<std::string>& groups, GroupType type,
-                                             const std::string& identifier, const AllIdentifiersWriteLock& lock);
+                                             const std::string& identifier, std::vector<FileURL>& changed,
+                                             const AllIdentifiersWriteLock& lock);
     void _removeGroupContainersIfNeededforUser(std::uint32_t userId, ContainerClass containerClass,
                                                const std::string& group, const std::string& identifier,
-                                               const References& references, const AllIdentifiersWriteLock& lock);
+                                               const References& references, std::vector<FileURL>& changed,
+                                               const AllIdentifiersWriteLock& lock);
     std::uint64_t _cleanupUnreferencedGroupContainersForUser(std::uint32_t userId, ContainerClass containerClass,
                                                              const References& references);
     /// Says it where a container could not be staged; whether it was.

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ZOREntitlementMapping.h"
 
+#include "base/BlockingScope.h"
 #include "base/UserIdentity.h"
 #include "fs/DictionaryFile.h"
 #include "ipc/Keys.h"
@@ -20,6 +21,9 @@ namespace {
 
 constexpr const char* processFunction = "_onQueue_processEntitlements";
 constexpr const char* setFunction = "_setEntitlementDictionaryValues";
+/// A value's bytes in the file are at most so many times those in memory: text that is not ASCII takes two bytes for a
+/// character, and each object a few for its place.
+constexpr std::size_t fileBytesForHeld = 2;
 
 /// The content under the map's own keys is the daemon's; anything else there counts as nothing.
 plist::Dictionary copyOf(const plist::Dictionary* dictionary) {
@@ -34,7 +38,8 @@ ZOREntitlementMapping::ZOREntitlementMapping(const Log& log, ZORFileManager& fil
       entitlementMappingFileUrl_(configuration.libraryDirectory().appendingFile(names::entitlementFile)),
       unreadableFileUrl_(
           entitlementMappingFileUrl_.deletingLastPathComponent().appendingFile(names::unreadableEntitlementFile)),
-      entitlementMappingDict_(_readEntitlementMappingFromDisk()) {}
+      entitlementMappingDict_(_readEntitlementMappingFromDisk()),
+      heldBytes_(plist::heldBytes(entitlementMappingDict_)) {}
 
 plist::Dictionary ZOREntitlementMapping::_readEntitlementMappingFromDisk() {
     auto map = readEntitlementFile(entitlementMappingFileUrl_, fileManager_);
@@ -81,73 +86,128 @@ std::optional<FileURL> ZOREntitlementMapping::lostFile() {
     return std::nullopt;
 }
 
-Result<void> ZOREntitlementMapping::_writeEntitlementMappingToDisk() {
+ZORError ZOREntitlementMapping::notWritten(const ZORError& cause) const {
+    return makeError(log_, {"_writeEntitlementMappingToDisk", __LINE__}, ErrorCode::entitlementFileNotWritten, &cause,
+                     LogFlag::yes, "Failed to write entitlement mapping file at %s",
+                     entitlementMappingFileUrl_.c_str());
+}
+
+Result<void> ZOREntitlementMapping::_writeEntitlementMappingToDisk(const plist::Dictionary& map) {
     configuration_.libraryDirectory(); // makes it again should it have gone
     auto written = unreadFileIsInPlace() ? moveUnreadableFileAside() : Result<void>();
     if (written)
-        written = writeToURL(entitlementMappingDict_, entitlementMappingFileUrl_,
-                             writeAtomically | writeWithoutProtection, entitlementFileBytesMax, fileManager_);
+        written = writeToURL(map, entitlementMappingFileUrl_, writeAtomically | writeWithoutProtection,
+                             entitlementFileBytesMax, fileManager_);
     if (!written)
-        return makeError(log_, ZOR_HERE, ErrorCode::entitlementFileNotWritten, &written.error(), LogFlag::yes,
-                         "Failed to write entitlement mapping file at %s", entitlementMappingFileUrl_.c_str());
+        return notWritten(written.error());
     fileIsUnread_ = false;
     return {};
 }
 
 Result<void> ZOREntitlementMapping::_setEntitlementDictionaryValues(const std::vector<plist::Dictionary>& values,
                                                                     const std::vector<std::string>& identifiers) {
-    const MutexLock held(entitlementQueue_);
-    return _onQueue_setEntitlementDictionaryValues(values, identifiers);
+    std::optional<Change> change;
+    {
+        const MutexLock held(entitlementQueue_);
+        change = TRY(_onQueue_apply(values, identifiers, identifiers));
+    }
+    return change ? save(*change) : Result<void>();
 }
 
-Result<void>
-ZOREntitlementMapping::_onQueue_setEntitlementDictionaryValues(const std::vector<plist::Dictionary>& values,
-                                                               const std::vector<std::string>& identifiers) {
-    if (values.size() != identifiers.size())
+std::optional<plist::Value> ZOREntitlementMapping::_onQueue_store(const std::string& key,
+                                                                  std::optional<plist::Value> value) {
+    const plist::Value* const current = entitlementMappingDict_.find(key);
+    std::optional<plist::Value> before = current ? std::optional(*current) : std::nullopt;
+    const auto held = [&](const std::optional<plist::Value>& one) {
+        return one ? sizeof key + key.size() + plist::heldBytes(*one) : 0;
+    };
+    const std::size_t bytes = heldBytes_ - held(before) + held(value);
+    if (value)
+        entitlementMappingDict_.set(key, std::move(*value));
+    else
+        entitlementMappingDict_.erase(key);
+    heldBytes_ = bytes;
+    return before;
+}
+
+Result<std::optional<ZOREntitlementMapping::Change>>
+ZOREntitlementMapping::_onQueue_apply(const std::vector<plist::Dictionary>& values,
+                                      const std::vector<std::string>& keys, const std::vector<std::string>& whose) {
+    if (values.size() != keys.size())
         return makeError(log_, {setFunction, __LINE__}, ErrorCode::entitlementCountsDiffer, nullptr, LogFlag::yes,
                          "Can't act on an invalid input: values count: %ld, IDs count: %ld",
-                         static_cast<long>(values.size()), static_cast<long>(identifiers.size()));
+                         static_cast<long>(values.size()), static_cast<long>(keys.size()));
     generation_.fetch_add(1, std::memory_order_acq_rel);
     std::vector<std::pair<std::string, std::optional<plist::Value>>> previous;
-    const bool wasUnsaved = unsaved_;
+    const Change owed = owed_;
+    const Change change = applied_ + 1;
     for (std::size_t i = 0; i < values.size(); ++i) {
         const bool hasValue = !values[i].empty();
-        const plist::Value* current = entitlementMappingDict_.find(identifiers[i]);
+        const plist::Value* current = entitlementMappingDict_.find(keys[i]);
         const plist::Dictionary* currentDictionary = current ? current->asDictionary() : nullptr;
         const bool unchanged = hasValue ? currentDictionary && *currentDictionary == values[i] : !current;
         if (unchanged)
             continue;
-        previous.emplace_back(identifiers[i], current ? std::optional(*current) : std::nullopt);
-        unsaved_ = true; // and so it stays if anything below throws
-        if (hasValue)
-            entitlementMappingDict_.set(identifiers[i], values[i]);
-        else
-            entitlementMappingDict_.erase(identifiers[i]);
+        owed_ = applied_ = change; // and so it stays if anything below throws
+        previous.emplace_back(keys[i], std::nullopt);
+        previous.back().second =
+            _onQueue_store(keys[i], hasValue ? std::optional<plist::Value>(values[i]) : std::nullopt);
         if (log_.writes(logLevelDebug)) {
             const plist::Value shown(values[i]);
-            log_.write(logLevelDebug, setFunction, "Staging Entitlement Mapping for ID: %s : %s",
-                       ZOR_SHOWN(identifiers[i]), plist::describe(hasValue ? &shown : nullptr).c_str());
+            log_.write(logLevelDebug, setFunction, "Staging Entitlement Mapping for ID: %s : %s", ZOR_SHOWN(keys[i]),
+                       plist::describe(hasValue ? &shown : nullptr).c_str());
         }
     }
-    if (previous.empty() && !unsaved_)
-        return {};
-    auto written = _writeEntitlementMappingToDisk();
-    // No later save could succeed either: this change alone is refused.
-    const bool takenBack = !written && written.error().underlying()->isPosix(EFBIG);
-    if (takenBack) {
-        for (auto& [key, value] : previous | std::views::reverse)
-            if (value)
-                entitlementMappingDict_.set(key, std::move(*value));
-            else
-                entitlementMappingDict_.erase(key);
+    if (previous.empty()) {
+        Change earlier = owed_;
+        for (const std::string& one : whose)
+            if (const auto unsaved = unsaved_.find(one); unsaved != unsaved_.end())
+                earlier = std::max(earlier, unsaved->second);
+        return earlier > saved_ ? std::optional(earlier) : std::nullopt;
     }
-    unsaved_ = takenBack ? wasUnsaved : !written;
-    if (!written)
+    Result<plist::Data> fits = plist::Data();
+    if (heldBytes_ > entitlementFileBytesMax / fileBytesForHeld)
+        fits = serialisedFor(entitlementMappingFileUrl_, entitlementMappingDict_, entitlementFileBytesMax);
+    if (!fits) { // no save could succeed any more: this change alone is refused
+        for (auto& [key, value] : previous | std::views::reverse)
+            _onQueue_store(key, std::move(value));
+        owed_ = owed;
+        return notWritten(fits.error());
+    }
+    for (const std::string& one : whose)
+        unsaved_[one] = change;
+    owed_ = owed;
+    return change;
+}
+
+Result<void> ZOREntitlementMapping::save(Change change, const std::function<void()>& before) {
+    const platform::BlockingScope blocking;
+    const MutexLock saving(saving_);
+    plist::Dictionary map;
+    Change last = 0;
+    {
+        const MutexLock held(entitlementQueue_);
+        if (saved_ >= change)
+            return {};
+        map = entitlementMappingDict_;
+        last = applied_;
+    }
+    if (before)
+        before();
+    auto written = _writeEntitlementMappingToDisk(map);
+    const MutexLock held(entitlementQueue_);
+    if (!written) {
+        // Who was told that nothing is due asks again.
+        generation_.fetch_add(1, std::memory_order_acq_rel);
+        owed_ = std::max(owed_, last);
         log_.write(logLevelError, setFunction, "Error writing entitlement mappings to disk after set : %s",
                    written.error().text().c_str());
-    else if (log_.writes(logLevelDebug))
-        log_.write(logLevelDebug, setFunction, "Wrote entitlement mappings to disk after set");
-    return written;
+        return written;
+    }
+    saved_ = last;
+    std::erase_if(unsaved_, [&](const auto& one) { return one.second <= last; });
+    ZOR_LOG(log_, logLevelDebug, "Wrote entitlement mappings to disk after set");
+    return {};
 }
 
 ZOREntitlementMapping::Identifiers ZOREntitlementMapping::_copyApplicationGroupEntitlementForIdentifier(
@@ -302,14 +362,20 @@ ZOREntitlementMapping::Plan ZOREntitlementMapping::plan(const plist::Dictionary*
                                                         const AllIdentifiersWriteLock& /*held*/) {
     const MutexLock held(entitlementQueue_);
     Plan plan;
+    plan.identifier = identifier;
     if (_onQueue_stage(plan, entitlements, identifier, options, SayStaging::yes))
         _onQueue_stageReleases(plan, entitlements, identifier);
     return plan;
 }
 
-Result<void> ZOREntitlementMapping::settle(const Plan& plan, const AllIdentifiersWriteLock& /*held*/) {
+Result<std::optional<ZOREntitlementMapping::Change>>
+ZOREntitlementMapping::apply(const Plan& plan, const AllIdentifiersWriteLock& /*held*/) {
     const MutexLock held(entitlementQueue_);
-    return _onQueue_setEntitlementDictionaryValues(plan.values, plan.keys);
+    return _onQueue_apply(plan.values, plan.keys, {plan.identifier});
+}
+
+bool ZOREntitlementMapping::_onQueue_isSaved(const std::string& identifier) const {
+    return owed_ <= saved_ && !unsaved_.contains(identifier);
 }
 
 bool ZOREntitlementMapping::_onQueue_changesNothing(const plist::Dictionary* entitlements,
@@ -317,7 +383,7 @@ bool ZOREntitlementMapping::_onQueue_changesNothing(const plist::Dictionary* ent
                                                     const plist::Dictionary* options) const {
     Plan plan;
     _onQueue_stage(plan, entitlements, identifier, options, SayStaging::no);
-    return !unsaved_ && plan.keys.empty();
+    return plan.keys.empty() && _onQueue_isSaved(identifier);
 }
 
 bool ZOREntitlementMapping::changesNothing(const plist::Dictionary* entitlements, const std::string& identifier,
@@ -352,9 +418,13 @@ std::vector<std::string> ZOREntitlementMapping::childrenOf(const std::string& id
 }
 
 Result<void> ZOREntitlementMapping::uniteEntitlements(const std::string& identifier, const plist::Dictionary& older) {
-    const MutexLock held(entitlementQueue_);
-    const plist::Dictionary* const entry = entitlementsOf(identifier);
-    return _onQueue_setEntitlementDictionaryValues({entry ? plist::united(*entry, older) : older}, {identifier});
+    std::optional<Change> change;
+    {
+        const MutexLock held(entitlementQueue_);
+        const plist::Dictionary* const entry = entitlementsOf(identifier);
+        change = TRY(_onQueue_apply({entry ? plist::united(*entry, older) : older}, {identifier}, {identifier}));
+    }
+    return change ? save(*change) : Result<void>();
 }
 
 bool ZOREntitlementMapping::groupIdsAreMigrated() {

@@ -1,10 +1,14 @@
 // SPDX-License-Identifier: Apache-2.0
 // What each identifier is entitled to: the persistent map from which every decision about shared containers is made.
 //
-// One file, loaded once, written whole after each change. The map is touched only on the entitlement queue, which
-// public operations enter synchronously; it is a mutex here, since nothing ever runs on it by itself. Operations whose
-// names begin with _onQueue_ run inside it and never enter it again. No container is looked for or moved here: a change
-// is planned, the caller does what it means for containers, and then the change is settled.
+// One file, loaded once, written whole. The map is touched only on the entitlement queue, which public operations enter
+// synchronously; it is a mutex here, since nothing ever runs on it by itself, and nobody waits for the disk on it.
+// Operations whose names begin with _onQueue_ run inside it and never enter it again. No container is looked for or
+// moved here: a change is planned, the caller does what it means for containers, the change is applied to the map, and
+// it is saved when the caller has let its locks go. Readers see each change whole, or not yet.
+//
+// Changes are numbered as they are applied, and one save takes along all that have been applied when it begins: the
+// others' savers find that done. Nobody is told of a change before it is saved, also not of one that is there already.
 //
 // A stop during a save leaves the old file or the new one. A file that is there but cannot be read is moved aside
 // before anything is saved: as long as it lies there, nothing may be deleted because the map does not mention it
@@ -21,7 +25,10 @@
 
 #include <array>
 #include <atomic>
+#include <cstddef>
 #include <cstdint>
+#include <functional>
+#include <map>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -59,6 +66,7 @@ public:
     /// What registering, changing or (`entitlements` nullptr) removing the entitlements of one identifier would store
     /// and release. Holds as long as nobody changes the map.
     struct Plan {
+        std::string identifier;
         // To be stored, in this order.
         std::vector<plist::Dictionary> values;
         std::vector<std::string> keys;
@@ -77,9 +85,18 @@ public:
     [[nodiscard]] Plan plan(const plist::Dictionary* entitlements, const std::string& identifier,
                             const plist::Dictionary* options, const AllIdentifiersWriteLock& lock)
         ZOR_EXCLUDES(entitlementQueue_);
-    /// Stores a plan that was made under the same lock. Error 59 when the file cannot be written.
-    Result<void> settle(const Plan& plan, const AllIdentifiersWriteLock& lock) ZOR_EXCLUDES(entitlementQueue_);
-    /// Whether a change would store nothing, and nothing is left to be saved.
+    /// A change of the map by its number; later ones have larger numbers.
+    using Change = std::uint64_t;
+    /// Puts a plan that was made under the same lock into the map. The change that has to be saved before anybody is
+    /// told; nullopt when the file says all of it. Error 59 for more than the file may hold: nothing has changed then.
+    Result<std::optional<Change>> apply(const Plan& plan, const AllIdentifiersWriteLock& lock)
+        ZOR_EXCLUDES(entitlementQueue_);
+    /// Returns when the file holds the change, and those before it. `before` runs when it has been settled which
+    /// changes are saved, and before they are: it makes durable what must not come after them. Error 59 when the file
+    /// cannot be written: the map keeps the change, and the next call saves it even when it changes nothing. The caller
+    /// holds no lock.
+    Result<void> save(Change change, const std::function<void()>& before = {}) ZOR_EXCLUDES(saving_, entitlementQueue_);
+    /// Whether a change would store nothing, and nothing is left to be saved that it would have stored.
     [[nodiscard]] bool changesNothing(const plist::Dictionary* entitlements, const std::string& identifier,
                                       const plist::Dictionary* options) ZOR_EXCLUDES(entitlementQueue_);
     /// Whether a peer with this identifier has to be registered as it comes: it has never been, or it was registered so
@@ -92,14 +109,13 @@ public:
     [[nodiscard]] std::uint64_t generation() const { return generation_.load(std::memory_order_acquire); }
 
     /// Stores a value under each key (an empty dictionary removes the key) and saves once, when anything changed. Error
-    /// 60 when the counts differ, 59 when the save fails: the map in memory then keeps the change, and the next call
-    /// saves it even when it changes nothing.
+    /// 60 when the counts differ, 59 as above.
     Result<void> _setEntitlementDictionaryValues(const std::vector<plist::Dictionary>& values,
                                                  const std::vector<std::string>& identifiers)
-        ZOR_EXCLUDES(entitlementQueue_);
+        ZOR_EXCLUDES(saving_, entitlementQueue_);
     /// Unites what an older system kept with what is stored for an identifier: nothing of that goes. Error 59.
     Result<void> uniteEntitlements(const std::string& identifier, const plist::Dictionary& older)
-        ZOR_EXCLUDES(entitlementQueue_);
+        ZOR_EXCLUDES(saving_, entitlementQueue_);
 
     /// Whether the group identifiers that older systems kept in data containers are in the map, since this boot at the
     /// latest, or there is nobody for whom they would have to be. As long as not, groups may be in use that the map
@@ -113,7 +129,8 @@ public:
 
 private:
     [[nodiscard]] plist::Dictionary _readEntitlementMappingFromDisk();
-    Result<void> _writeEntitlementMappingToDisk() ZOR_REQUIRES(entitlementQueue_);
+    Result<void> _writeEntitlementMappingToDisk(const plist::Dictionary& map) ZOR_REQUIRES(saving_);
+    ZORError notWritten(const ZORError& cause) const;
     /// An error, not logged, when it could not be moved. One that lies aside already lets this one stay.
     Result<void> moveUnreadableFileAside();
     [[nodiscard]] bool unreadFileIsInPlace();
@@ -147,9 +164,14 @@ private:
         ZOR_REQUIRES(entitlementQueue_);
     [[nodiscard]] bool _onQueue_changesNothing(const plist::Dictionary* entitlements, const std::string& identifier,
                                                const plist::Dictionary* options) const ZOR_REQUIRES(entitlementQueue_);
-    Result<void> _onQueue_setEntitlementDictionaryValues(const std::vector<plist::Dictionary>& values,
-                                                         const std::vector<std::string>& identifiers)
+    /// `whose`: the identifiers that are told of the change.
+    Result<std::optional<Change>> _onQueue_apply(const std::vector<plist::Dictionary>& values,
+                                                 const std::vector<std::string>& keys,
+                                                 const std::vector<std::string>& whose) ZOR_REQUIRES(entitlementQueue_);
+    /// The value that was there. An empty one removes the key.
+    std::optional<plist::Value> _onQueue_store(const std::string& key, std::optional<plist::Value> value)
         ZOR_REQUIRES(entitlementQueue_);
+    [[nodiscard]] bool _onQueue_isSaved(const std::string& identifier) const ZOR_REQUIRES(entitlementQueue_);
 
     const Log& log_;
     ZORFileManager& fileManager_;
@@ -162,11 +184,20 @@ private:
     std::atomic<bool> groupIdsAreMigrated_{false};
     /// Raised on the queue, before the map changes.
     std::atomic<std::uint64_t> generation_{1};
+    /// Held while the file is written, never under the entitlement queue.
+    platform::Mutex saving_;
     platform::Mutex entitlementQueue_;
     plist::Dictionary entitlementMappingDict_ ZOR_GUARDED_BY(entitlementQueue_);
-    /// The last save failed: the map is ahead of the file, and no change may be answered with success before one
-    /// succeeds.
-    bool unsaved_ ZOR_GUARDED_BY(entitlementQueue_) = false;
+    /// Memory of the map's keys and values.
+    std::size_t heldBytes_ ZOR_GUARDED_BY(entitlementQueue_) = 0;
+    /// The last that was applied, and the last that the file holds.
+    Change applied_ ZOR_GUARDED_BY(entitlementQueue_) = 0;
+    Change saved_ ZOR_GUARDED_BY(entitlementQueue_) = 0;
+    /// No change at all may be answered with success before the file holds this one: its save has failed, or an
+    /// exception has ended it half-way.
+    Change owed_ ZOR_GUARDED_BY(entitlementQueue_) = 0;
+    /// Those told of a change that is not saved: the last one of each.
+    std::map<std::string, Change, std::less<>> unsaved_ ZOR_GUARDED_BY(entitlementQueue_);
 };
 
 } // namespace zor

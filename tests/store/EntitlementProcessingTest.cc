@@ -6,6 +6,7 @@
 #include "world/World.h"
 
 #include <algorithm>
+#include <atomic>
 #include <future>
 #include <gtest/gtest.h>
 #include <set>
@@ -222,8 +223,8 @@ TEST_F(Processing, TheMapAfterEachCall) {
     ASSERT_TRUE(
         mapping()._setEntitlementDictionaryValues({Dictionary{{"a", Array{"b", placeholder, 5, "c"}}}}, {children}));
     ASSERT_EQ(process(e, "kept", caller), success);
-    world.services().store().entitlementChange.removeEntitlementDictionariesForIdentifierAndItsChildren(
-        "a", AllIdentifiersWriteLock(world.services().locks()));
+    EXPECT_TRUE(world.services().store().entitlementChange.removeEntitlementDictionariesForIdentifierAndItsChildren(
+        "a", AllIdentifiersWriteLock(world.services().locks())));
     EXPECT_EQ(mapping().entitlementMappingDict(), (Dictionary{{"kept", e}, {byCaller, Dictionary{{"kept", true}}}}));
 }
 
@@ -248,6 +249,35 @@ TEST_F(Processing, ChangesThatCannotBeSaved) {
               ErrorCode::entitlementFileNotWritten);
     EXPECT_EQ(mapping().entryCount(), 0U);
     EXPECT_EQ(process(e, "b"), ErrorCode::success);
+}
+
+// Goal: while a change is being saved, readers see it, nobody holds the lock, and only who asks for the same change
+// waits. Method: in the first sync of a save, what others do.
+TEST_F(Processing, ASaveHoldsOnlyItsOwnChange) {
+    const Dictionary e{{"k", 1}};
+    ASSERT_EQ(process(e, "before"), ErrorCode::success);
+    std::future<ErrorCode> again;
+    std::future<ErrorCode> next;
+    std::atomic<bool> entered{false};
+    world.disk().before = [&](const DiskCallInfo& call) {
+        if (call.call != DiskCall::sync || entered.exchange(true))
+            return;
+        EXPECT_TRUE(mapping().entitlementsExistForIdentifier("a"));
+        EXPECT_TRUE(world.services().locks().quietGeneration());
+        EXPECT_EQ(process(e, "before"), ErrorCode::success);
+        again = std::async(std::launch::async, [&] { return process(e, "a"); });
+        next = std::async(std::launch::async, [&] { return process(e, "b"); });
+        EXPECT_EQ(again.wait_for(std::chrono::milliseconds(50)), std::future_status::timeout);
+        EXPECT_EQ(next.wait_for(std::chrono::milliseconds(50)), std::future_status::timeout);
+        EXPECT_TRUE(mapping().entitlementsExistForIdentifier("b"));
+    };
+    EXPECT_EQ(process(e, "a"), ErrorCode::success);
+    EXPECT_EQ(again.get(), ErrorCode::success);
+    EXPECT_EQ(next.get(), ErrorCode::success);
+    world.disk().before = nullptr;
+    world.restart();
+    for (const char* saved : {"before", "a", "b"})
+        EXPECT_TRUE(mapping().entitlementsExistForIdentifier(saved));
 }
 
 // Goal: a boot removes exactly the groups that nobody lists. Method: containers of each kind, then a boot.
