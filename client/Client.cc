@@ -8,6 +8,7 @@
 #include "ipc/Uuid.h"
 
 #include <charconv>
+#include <iterator>
 #include <type_traits>
 #include <utility>
 
@@ -64,8 +65,10 @@ Value converted(const plist::Value& value) {
         List& list = made.content.emplace<List>();
         for (const plist::Value& element : *array)
             list.push_back(converted(element));
-    } else {
-        made.content = plist::describe(&value); // dates and data, for people
+    } else if (const plist::Data* data = value.asData()) {
+        made.content = *data;
+    } else if (const plist::Date* date = value.asDate()) {
+        made.content = Date{date->secondsSinceReference};
     }
     return made;
 }
@@ -90,6 +93,8 @@ plist::Value unconverted(const Value& value) {
                 return array;
             } else if constexpr (std::is_same_v<Content, Map>) {
                 return unconverted(content);
+            } else if constexpr (std::is_same_v<Content, Date>) {
+                return plist::Date{content.seconds};
             } else {
                 return plist::Value(content);
             }
@@ -223,30 +228,50 @@ Result<Container> Client::createOrLookup(const Lookup& lookup) {
         .uuid = *uuid, .identifier = *identifier, .path = *path, .existed = reply->isTrue(keys::replyExisted)};
 }
 
-Result<std::vector<ListedContainer>> Client::list(std::uint64_t containerClass, std::uint32_t user, bool transient) {
+Result<Client::Page> Client::listPage(std::uint64_t containerClass, std::uint32_t user, bool transient,
+                                      const std::string& after) {
     plist::Dictionary message = request(ipc::Command::listContainers);
     message.set(keys::containerClass, containerClass);
     message.set(keys::userId, user);
     message.set(keys::transient, transient);
-    std::vector<ListedContainer> containers;
+    message.set(keys::pageAfter, after);
+    const auto reply = connection_->call(message);
+    if (!reply)
+        return std::unexpected(reply.error());
+    Page page;
+    if (!appendListed(*reply, page.containers))
+        return incomplete();
     // A daemon that knows no pages answers with the whole list, and names no next one.
-    for (std::optional<std::string> page = ""; page;) {
-        message.set(keys::pageAfter, *page);
-        const auto reply = connection_->call(message);
-        if (!reply)
-            return std::unexpected(reply.error());
-        if (!appendListed(*reply, containers))
+    if (const std::string* next = reply->string(keys::replyNextPage)) {
+        if (*next <= after) // the list would never end
             return incomplete();
-        const std::string* next = reply->string(keys::replyNextPage);
-        if (next && *next <= *page) // the list would never end
-            return incomplete();
-        page = next ? std::optional(*next) : std::nullopt;
+        page.next = *next;
+    }
+    return page;
+}
+
+Result<std::vector<ListedContainer>> Client::list(std::uint64_t containerClass, std::uint32_t user, bool transient) {
+    std::vector<ListedContainer> containers;
+    for (std::optional<std::string> after = ""; after;) {
+        auto page = listPage(containerClass, user, transient, *after);
+        if (!page)
+            return std::unexpected(page.error());
+        containers.insert(containers.end(), std::make_move_iterator(page->containers.begin()),
+                          std::make_move_iterator(page->containers.end()));
+        after = std::move(page->next);
     }
     return containers;
 }
 
 Result<void> Client::emptyDeathRow() {
     return withoutContent(connection_->call(request(ipc::Command::deleteContainersOnDeathRow)));
+}
+
+Result<void> Client::retryTest(std::uint32_t user, std::uint64_t crashes) {
+    plist::Dictionary message = request(ipc::Command::retryTest);
+    message.set(keys::userId, user);
+    message.set(keys::numRetryCrashes, crashes);
+    return withoutContent(connection_->call(message));
 }
 
 Result<void> Client::stageForDelete(const std::vector<Address>& containers) {
@@ -296,6 +321,13 @@ Result<void> Client::replace(const std::optional<Address>& old, const Address& f
 Result<void> Client::wipe(std::uint64_t containerClass, std::uint32_t user, const std::string& identifier) {
     plist::Dictionary message = request(ipc::Command::wipeDataContainerContent);
     message.set(keys::containerClass, containerClass);
+    message.set(keys::userId, user);
+    message.set(keys::identifier, identifier);
+    return withoutContent(connection_->call(message));
+}
+
+Result<void> Client::wipePluginData(std::uint32_t user, const std::string& identifier) {
+    plist::Dictionary message = request(ipc::Command::wipeEntitledPluginDataContainer);
     message.set(keys::userId, user);
     message.set(keys::identifier, identifier);
     return withoutContent(connection_->call(message));

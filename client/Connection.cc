@@ -13,6 +13,8 @@
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
+#include <iterator>
+#include <limits>
 #include <poll.h>
 #include <sys/socket.h>
 #include <sys/time.h>
@@ -50,6 +52,9 @@ sockaddr_un addressOf(const std::string& path, const std::string& name, int dire
     std::memcpy(address.sun_path, text.data(), std::min(text.size(), sizeof address.sun_path - 1));
     return address;
 }
+
+/// How long a connect waits at a time where it can be interrupted.
+constexpr std::chrono::milliseconds connectTurn{100};
 
 /// A connect waits for room among those who have not been accepted yet: of a daemon that is still starting, other users
 /// can take all of it.
@@ -119,14 +124,27 @@ Result<Client::Connection> Client::Connection::open(const ConnectOptions& option
         return fail(Error::Kind::unreachable, withReason("cannot make a socket", errno));
     const sockaddr_un address = addressOf(path, name, directory.get());
     Connection connection(std::move(socket), options);
-    limitConnecting(connection.socket_.get(), connection.timeoutMilliseconds());
-    const bool connected =
-        ::connect(connection.socket_.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
-    if (!connected && errno == EAGAIN)
-        return std::unexpected(whySilent(-1, connection.timeoutMilliseconds()));
-    if (!connected)
-        return fail(Error::Kind::unreachable, withReason("cannot reach zorvaned at " + path, errno));
-    return connection;
+    connection.startTime(connection.timeoutMilliseconds());
+    for (;;) {
+        limitConnecting(connection.socket_.get(), connection.connectMilliseconds());
+        if (::connect(connection.socket_.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0)
+            return connection;
+        if (errno != EINTR && errno != EAGAIN)
+            return fail(Error::Kind::unreachable, withReason("cannot reach zorvaned at " + path, errno));
+        // A socket without a peer is always ready: this asks only whether the time is over.
+        if (const auto time = connection.waitFor(0); !time)
+            return std::unexpected(connection.explained(time.error()));
+    }
+}
+
+std::uint32_t Client::Connection::connectMilliseconds() const {
+    using std::chrono::milliseconds;
+    milliseconds turn = options_.interruptDescriptor >= 0 ? connectTurn : milliseconds(0);
+    if (deadline_) {
+        const auto left = std::max(std::chrono::ceil<milliseconds>(*deadline_ - Clock::now()), milliseconds(1));
+        turn = turn == milliseconds(0) ? left : std::min(turn, left);
+    }
+    return static_cast<std::uint32_t>(turn.count());
 }
 
 std::uint32_t Client::Connection::timeoutMilliseconds() const {
@@ -142,17 +160,26 @@ void Client::Connection::startTime(std::uint32_t milliseconds) {
 }
 
 Result<void> Client::Connection::waitFor(short events) {
-    if (!deadline_)
+    if (!pollWaits())
         return {}; // the blocking call that follows waits
     for (;;) {
-        const auto left = std::chrono::ceil<std::chrono::milliseconds>(*deadline_ - Clock::now()).count();
-        pollfd descriptor{.fd = socket_.get(), .events = events, .revents = 0};
-        const int ready = left > 0 ? ::poll(&descriptor, 1, static_cast<int>(left)) : 0;
+        constexpr std::int64_t pollMillisecondsMax = std::numeric_limits<int>::max();
+        const std::int64_t left =
+            deadline_ ? std::chrono::ceil<std::chrono::milliseconds>(*deadline_ - Clock::now()).count() : -1;
+        if (deadline_ && left <= 0)
+            return fail(Error::Kind::timedOut, "zorvaned did not answer in time");
+        // poll leaves a negative descriptor out.
+        pollfd descriptors[] = {{.fd = socket_.get(), .events = events, .revents = 0},
+                                {.fd = options_.interruptDescriptor, .events = POLLIN, .revents = 0}};
+        const int ready =
+            ::poll(descriptors, std::size(descriptors), static_cast<int>(std::min(left, pollMillisecondsMax)));
+        if (ready > 0 && descriptors[1].revents != 0) {
+            interrupted_ = true;
+            return fail(Error::Kind::timedOut, "the call was given up; the command may still be carried out");
+        }
         if (ready > 0)
             return {};
-        if (ready == 0)
-            return fail(Error::Kind::timedOut, "zorvaned did not answer in time");
-        if (errno != EINTR)
+        if (ready < 0 && errno != EINTR)
             return fail(Error::Kind::unreachable, withReason("cannot wait for zorvaned", errno));
     }
 }
@@ -170,9 +197,8 @@ Result<std::uint64_t> Client::Connection::send(const plist::Dictionary& request)
     for (std::size_t sent = 0; sent < frame.size();) {
         if (auto ready = waitFor(POLLOUT); !ready)
             return std::unexpected(ready.error());
-        // With a time limit it is the poll that waits: a blocking send could wait for the rest of the frame without
-        // one.
-        const int flags = deadline_ ? MSG_NOSIGNAL | MSG_DONTWAIT : MSG_NOSIGNAL;
+        // A blocking send could wait for the rest of the frame without a limit.
+        const int flags = pollWaits() ? MSG_NOSIGNAL | MSG_DONTWAIT : MSG_NOSIGNAL;
         const ssize_t count = ::send(socket_.get(), frame.data() + sent, frame.size() - sent, flags);
         if (count < 0 && (errno == EINTR || errno == EAGAIN))
             continue;
@@ -233,7 +259,7 @@ Result<plist::Dictionary> Client::Connection::replyTo(std::uint64_t id) {
 Error Client::Connection::explained(const Error& error) const {
     if (error.kind == Error::Kind::refused)
         return whyEnded(options_, std::chrono::duration_cast<std::chrono::milliseconds>(Clock::now() - connected_));
-    if (error.kind == Error::Kind::timedOut)
+    if (error.kind == Error::Kind::timedOut && !interrupted_)
         return whySilent(processBehind(socket_.get()), limitMilliseconds_);
     return error;
 }

@@ -16,7 +16,7 @@ namespace zorvane {
 
 using Clock = std::chrono::steady_clock;
 
-class Client::Connection {
+class [[gnu::visibility("hidden")]] Client::Connection {
 public:
     enum class Service { commands, status };
     [[nodiscard]] static Result<Connection> open(const ConnectOptions& options, Service service);
@@ -44,7 +44,11 @@ private:
     Result<std::uint64_t> send(const zor::plist::Dictionary& request);
     Result<zor::plist::Dictionary> replyTo(std::uint64_t id);
     Result<void> readAll(std::uint8_t* bytes, std::size_t count);
+    /// Whether a time limit or an interruption ends a wait: then it is poll that waits.
+    [[nodiscard]] bool pollWaits() const { return deadline_ || options_.interruptDescriptor >= 0; }
     Result<void> waitFor(short events);
+    /// What a connect may take before it is tried again; 0 is for ever.
+    [[nodiscard]] std::uint32_t connectMilliseconds() const;
 
     zor::platform::FileDescriptor socket_;
     ConnectOptions options_;
@@ -52,6 +56,7 @@ private:
     /// The fields of the call that goes on.
     std::uint32_t limitMilliseconds_ = 0;
     std::optional<Clock::time_point> deadline_;
+    bool interrupted_ = false;
     std::uint64_t lastId_ = 0;
     std::map<std::uint64_t, zor::plist::Dictionary> early_;
 };

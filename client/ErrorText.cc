@@ -2,7 +2,9 @@
 // What the daemon's codes mean to people, in one table.
 #include "zorvane/Error.h"
 
+#include <algorithm>
 #include <cstring>
+#include <iterator>
 
 namespace zorvane {
 
@@ -167,7 +169,14 @@ constexpr Row rows[] = {
       "the container is in its place with its old owner", seeLog}},
 };
 
+/// The daemon's codes for what is not there: a container, an info key.
+constexpr std::uint64_t codesNotFound[] = {21, 24};
+
 } // namespace
+
+bool isNotFound(const Error& error) {
+    return error.kind == Error::Kind::daemon && std::ranges::find(codesNotFound, error.code) != std::end(codesNotFound);
+}
 
 ErrorText errorText(std::uint64_t code) {
     for (const Row& row : rows)

@@ -1,6 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Output.h"
 
+#include "plist/Value.h"
+
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
@@ -57,9 +59,6 @@ std::string adviceFor(const zorvane::Error& error) {
     return "";
 }
 
-/// The daemon's codes for what is not there: a container, an info key.
-constexpr std::uint64_t codesNotFound[] = {21, 24};
-
 int exitCodeOf(const zorvane::Error& error) {
     using Kind = zorvane::Error::Kind;
     switch (error.kind) {
@@ -72,7 +71,7 @@ int exitCodeOf(const zorvane::Error& error) {
     case Kind::protocol:
         break;
     case Kind::daemon:
-        if (std::ranges::find(codesNotFound, error.code) != std::end(codesNotFound))
+        if (zorvane::isNotFound(error))
             return exitNotFound;
     }
     return exitDaemonError;
@@ -298,6 +297,12 @@ nlohmann::json toJson(const zorvane::Value& value) {
                 for (const auto& [key, element] : content)
                     object[key] = toJson(element);
                 return object;
+            } else if constexpr (std::is_same_v<Content, zorvane::Data>) {
+                const zor::plist::Value data(content);
+                return zor::plist::describe(&data);
+            } else if constexpr (std::is_same_v<Content, zorvane::Date>) {
+                const zor::plist::Value date(zor::plist::Date{content.seconds});
+                return zor::plist::describe(&date);
             } else {
                 return content;
             }

@@ -36,6 +36,9 @@ struct ConnectOptions {
     /// ZORVANE_TIMEOUT_MILLISECONDS says, else a minute, and for calls that walk a tree of files or wait for an unlock
     /// (emptyDeathRow, wipe, replace, diskUsage, recreateDefaultStructure, setDataProtection) for ever.
     std::optional<std::uint32_t> timeoutMilliseconds = {};
+    /// Once this descriptor is readable, whatever waits ends, within about a second: an error of kind timedOut. It
+    /// stays the caller's. -1: there is none.
+    int interruptDescriptor = -1;
 };
 
 /// The user id in a request that stands for the current mobile user.
@@ -117,6 +120,9 @@ public:
     [[nodiscard]] Result<void> replace(const std::optional<Address>& old, const Address& fresh);
     /// Empties a data container: path and UUID stay.
     [[nodiscard]] Result<void> wipe(std::uint64_t containerClass, std::uint32_t user, const std::string& identifier);
+    /// The same for a plug-in's data (class 4), by a program whose registry entry names that plug-in. Code 55: it does
+    /// not.
+    [[nodiscard]] Result<void> wipePluginData(std::uint32_t user, const std::string& identifier);
 
     struct Metadata {
         std::string path;
@@ -180,9 +186,22 @@ public:
     /// In no particular order. The list is asked for in pages: what is made or goes meanwhile may be in it or not.
     [[nodiscard]] Result<std::vector<ListedContainer>> list(std::uint64_t containerClass, std::uint32_t user,
                                                             bool transient);
+    /// One page of it, in the order of the identifiers' bytes.
+    struct Page {
+        std::vector<ListedContainer> containers;
+        /// To be asked for after this one; nothing: this was the last.
+        std::optional<std::string> next;
+    };
+    /// `after` is empty for the first page, then what the page before names.
+    [[nodiscard]] Result<Page> listPage(std::uint64_t containerClass, std::uint32_t user, bool transient,
+                                        const std::string& after);
 
     /// Deletes what is on death row, and returns when that is done. Other answers of this connection may come before.
     [[nodiscard]] Result<void> emptyDeathRow();
+
+    /// For tests of clients: on an internal build, the daemon ends without an answer as often as this says, and then
+    /// answers. Elsewhere nothing happens.
+    [[nodiscard]] Result<void> retryTest(std::uint32_t user, std::uint64_t crashes);
 
     /// The implementation's own.
     class Connection;

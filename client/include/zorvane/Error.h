@@ -33,6 +33,9 @@ struct Error {
     std::string advice = {};
 };
 
+/// The daemon found no such container, or no such info key in it.
+[[nodiscard]] bool isNotFound(const Error& error);
+
 /// What a code of the daemon means, how it comes about, what follows from it, and what to do. Static strings, never
 /// null or empty.
 struct ErrorText {
