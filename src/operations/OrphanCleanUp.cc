@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "operations/OrphanCleanUp.h"
 
+#include "fs/Names.h"
 #include "fs/Stretches.h"
 #include "store/Names.h"
 
@@ -20,7 +21,7 @@ constexpr std::array orphanReportHead = {
 };
 constexpr const char* orphanReportEnd = "***END INTERNAL BUILD REQUEST";
 /// So many entries of a class directory are judged at once: enough for several threads, little enough for any memory.
-constexpr std::size_t orphanBatchMax = 1024;
+constexpr std::size_t orphanBatchMax = 4096;
 
 } // namespace
 
@@ -57,9 +58,10 @@ std::uint64_t OrphanCleanUp::_cleanupOrphanedDataForUser(std::uint32_t userId, C
         return 0;
     std::uint64_t removed = 0;
     std::vector<FileURL> batch;
+    std::vector<FileURL> leftovers;
     const auto listed = needs_.fileManager.forEachItemInDirectoryAtURL(
-        directory->url, ZORFileManager::Leftovers::hidden, [&](int, const FileURL& entry) {
-            batch.push_back(entry);
+        directory->url, ZORFileManager::Leftovers::shown, [&](int, const FileURL& entry) {
+            (fs::isCopyLeftover(entry.lastPathComponent()) ? leftovers : batch).push_back(entry);
             if (batch.size() == orphanBatchMax)
                 removed += removeOrphans(directory->opened->get(), std::exchange(batch, {}), containerClass);
             return needs_.report.goOn();
@@ -70,7 +72,7 @@ std::uint64_t OrphanCleanUp::_cleanupOrphanedDataForUser(std::uint32_t userId, C
     if (!listed || needs_.report.stopped())
         return removed;
     removed += removeOrphans(directory->opened->get(), batch, containerClass);
-    discardCopyLeftovers(directory->url);
+    discard(leftovers);
     return removed;
 }
 
@@ -98,7 +100,11 @@ std::uint64_t OrphanCleanUp::removeOrphans(int classDirectory, const std::vector
 }
 
 void OrphanCleanUp::discardCopyLeftovers(const FileURL& directory) {
-    for (const FileURL& leftover : needs_.fileManager.copyLeftoversInDirectoryAtURL(directory))
+    discard(needs_.fileManager.copyLeftoversInDirectoryAtURL(directory));
+}
+
+void OrphanCleanUp::discard(const std::vector<FileURL>& leftovers) {
+    for (const FileURL& leftover : leftovers)
         (void)needs_.deathRow._moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
 }
 

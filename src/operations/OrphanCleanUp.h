@@ -44,6 +44,7 @@ private:
     Orphan orphanKind(int classDirectory, const FileURL& entry, ContainerClass containerClass);
     void reportOrphan(const FileURL& entry);
     /// `classDirectory` is open and holds the entries. How many went.
+    void discard(const std::vector<FileURL>& leftovers);
     std::uint64_t removeOrphans(int classDirectory, const std::vector<FileURL>& entries, ContainerClass containerClass);
 
     const Needs needs_;
