@@ -14,8 +14,8 @@
 #pragma once
 
 #include "base/Mutex.h"
-#include "fs/BoundedQuestion.h"
 #include "fs/ItemStatus.h"
+#include "os/BoundedQuestion.h"
 #include "os/FileDescriptor.h"
 
 #include <atomic>
@@ -90,7 +90,7 @@ private:
 
     const Kind kind_;
     const std::shared_ptr<Judgement> judgement_;
-    BoundedQuestion<Answered> question_;
+    platform::BoundedQuestion<Answered> question_;
 };
 
 class MountFences {

@@ -7,7 +7,6 @@
 #include "plist/Value.h"
 
 #include <algorithm>
-#include <fcntl.h>
 #include <map>
 
 namespace zor::platform {
@@ -46,13 +45,6 @@ void IdentityRegistry::unfollow(RunLoop& loop) {
 std::shared_ptr<const IdentityRegistry::Snapshot> IdentityRegistry::snapshot() const {
     const MutexLock lock(publishing_);
     return snapshot_;
-}
-
-std::optional<FileId> IdentityRegistry::executableAt(const std::string& path) {
-    struct stat status{};
-    if (::fstatat(AT_FDCWD, path.c_str(), &status, 0) != 0 || !S_ISREG(status.st_mode))
-        return std::nullopt;
-    return FileId{.device = status.st_dev, .inode = status.st_ino};
 }
 
 void IdentityRegistry::lookIfDue(std::int64_t now) {
@@ -110,8 +102,12 @@ void IdentityRegistry::look(Read read) {
     if (std::ranges::any_of(problems, &RegistryProblem::isShortage))
         return sayProblems(std::move(problems));
     for (Registered& registered : entries) {
-        watches_.watchExecutable(registered.entry->executable);
-        registered.executable = executableAt(registered.entry->executable);
+        const auto found = watches_.watchExecutable(registered.entry->executable, executables_);
+        if (found)
+            registered.executable = found->file;
+        else
+            problems.push_back({.text = formatted("%s names %s, whose file system does not answer",
+                                                  registered.fileName.c_str(), registered.entry->executable.c_str())});
     }
     watches_.end();
     uniteIdentifiers(entries);
@@ -122,7 +118,7 @@ void IdentityRegistry::look(Read read) {
 }
 
 bool IdentityRegistry::looksUnchanged(const Snapshot& old) const {
-    return directory_.list().sameAs(listing_) && std::ranges::all_of(old.entries, [](const Registered& registered) {
+    return directory_.list().sameAs(listing_) && std::ranges::all_of(old.entries, [this](const Registered& registered) {
                return executableAt(registered.entry->executable) == registered.executable;
            });
 }

@@ -17,6 +17,7 @@
 #pragma once
 
 #include "base/Mutex.h"
+#include "identity/RegisteredExecutables.h"
 #include "identity/RegistryDirectory.h"
 #include "identity/RegistryWatches.h"
 #include "platform/PlatformLog.h"
@@ -36,7 +37,8 @@ public:
     struct Registered {
         std::string fileName;
         std::shared_ptr<const RegistryEntry> entry;
-        /// The file that the entry's path named when it was looked at last; absent when that was no file.
+        /// The file that the entry's path named when it was looked at last; absent when that was no file, or when its
+        /// file system did not answer.
         std::optional<FileId> executable;
         bool operator==(const Registered&) const = default;
     };
@@ -68,8 +70,10 @@ public:
     /// For a peer that no entry names: looks at everything again, unless that was done a moment ago. Whether it did.
     bool lookAgain() ZOR_EXCLUDES(reading_);
 
-    /// The file that `path` names now, when that is a regular one. Follows links.
-    [[nodiscard]] static std::optional<FileId> executableAt(const std::string& path);
+    /// The regular file that an entry's path names now.
+    [[nodiscard]] std::optional<FileId> executableAt(const std::string& path) const {
+        return executables_.fileAt(path);
+    }
 
 private:
     /// `changed`: what looks as it did is not read again. `all`: everything is, because a notice said that it changed.
@@ -91,6 +95,8 @@ private:
     std::atomic<std::uint64_t> generation_{0};
     /// Milliseconds of the coarse monotonic clock.
     std::atomic<std::int64_t> dueMilliseconds_{0};
+
+    mutable RegisteredExecutables executables_;
 
     Mutex reading_;
     RegistryWatches watches_ ZOR_GUARDED_BY(reading_);

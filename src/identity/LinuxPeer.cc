@@ -107,7 +107,7 @@ LinuxPeer::Judgement LinuxPeer::judge(const IdentityRegistry::Snapshot& snapshot
         if (registered.executable != executable)
             continue;
         // Inode numbers are used again: what the path names is looked at once more before power is given.
-        if (IdentityRegistry::executableAt(registered.entry->executable) != executable)
+        if (registry_.executableAt(registered.entry->executable) != executable)
             continue;
         judgement.named = true;
         const auto reason = mismatch(*registered.entry);

@@ -58,7 +58,7 @@ void remarkEntitlements(RegistryFileReport& report, const plist::Dictionary& ent
 
 void remarkEntry(RegistryFileReport& report) {
     const RegistryEntry& entry = *report.entry;
-    report.executable = IdentityRegistry::executableAt(entry.executable);
+    report.executable = RegisteredExecutables().fileAt(entry.executable);
     if (!report.executable)
         report.remarks.push_back("no file is at " + entry.executable);
     if (entry.grant->entitlements)

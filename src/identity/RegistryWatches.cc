@@ -6,7 +6,7 @@
 #include "os/Openat2.h"
 
 #include <algorithm>
-#include <climits>
+#include <chrono>
 #include <fcntl.h>
 #include <unistd.h>
 
@@ -18,30 +18,26 @@ constexpr std::uint32_t nameEvents =
     IN_CREATE | IN_DELETE | IN_MOVED_TO | IN_MOVED_FROM | IN_DELETE_SELF | IN_MOVE_SELF;
 constexpr std::uint32_t contentEvents = nameEvents | IN_CLOSE_WRITE | IN_MODIFY | IN_ATTRIB;
 
-/// The path without its last link, if it ends in one; empty when there is nothing of that name.
-std::string resolved(const std::string& path) {
-    const FileDescriptor file(::open(path.c_str(), O_PATH | O_CLOEXEC));
-    if (!file.valid())
-        return {};
-    char buffer[PATH_MAX];
-    const std::string link = "/proc/self/fd/" + std::to_string(file.get());
-    const ssize_t bytes = ::readlink(link.c_str(), buffer, sizeof buffer);
-    return bytes > 0 ? std::string(buffer, static_cast<std::size_t>(bytes)) : std::string();
+/// A look at the registry waits for one dead file system; those after it have had that time.
+constexpr std::chrono::milliseconds patience{1000};
+constexpr std::chrono::milliseconds patienceAfterOne{10};
+
+std::shared_ptr<const FileDescriptor> newInotify() {
+    return std::make_shared<const FileDescriptor>(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
 }
 
 } // namespace
 
-RegistryWatches::RegistryWatches(const SystemRoot& root)
-    : root_(root), inotify_(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK)) {}
+RegistryWatches::RegistryWatches(const SystemRoot& root) : root_(root), inotify_(newInotify()) {}
 
 RegistryWatches::Noticed RegistryWatches::take() {
     Noticed most = Noticed::nothing;
-    if (!inotify_.valid()) {
+    if (!inotify_->valid()) {
         // None could be had for want of something: everything is watched and read anew as soon as one can.
-        inotify_.reset(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
-        return inotify_.valid() ? Noticed::registry : most;
+        inotify_ = newInotify();
+        return inotify_->valid() ? Noticed::registry : most;
     }
-    readInotify(inotify_.get(), [&](const inotify_event& event, std::string_view name) {
+    readInotify(inotify_->get(), [&](const inotify_event& event, std::string_view name) {
         most = std::max(most, judge(event, name));
         followWriters(event, name);
         return true;
@@ -75,20 +71,21 @@ void RegistryWatches::followWriters(const inotify_event& event, std::string_view
 
 void RegistryWatches::begin() {
     interestsNew_.clear();
-    complete_ = inotify_.valid();
+    complete_ = inotify_->valid();
+    silent_ = 0;
 }
 
 void RegistryWatches::end() {
     for (const auto& [number, interest] : interests_) {
         if (!interestsNew_.contains(number))
-            (void)::inotify_rm_watch(inotify_.get(), number);
+            (void)::inotify_rm_watch(inotify_->get(), number);
     }
     interests_.swap(interestsNew_);
     interestsNew_.clear();
 }
 
 RegistryWatches::Interest* RegistryWatches::watch(int directory, std::uint32_t events, Noticed kind) {
-    const auto number = watchDirectory(inotify_.get(), directory, events | IN_MASK_ADD);
+    const auto number = watchDirectory(inotify_->get(), directory, events | IN_MASK_ADD);
     if (!number) {
         complete_ = false;
         return nullptr;
@@ -120,22 +117,21 @@ void RegistryWatches::watchRegistry() {
     }
 }
 
-void RegistryWatches::watchExecutable(const std::string& path) {
-    watchNameAt(path);
-    const std::string target = resolved(path);
-    if (!target.empty() && target != path)
-        watchNameAt(target);
-}
-
-void RegistryWatches::watchNameAt(const std::string& path) {
-    const std::size_t slash = path.rfind('/');
-    const FileDescriptor parent(::open(path.substr(0, slash + 1).c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-    if (!parent.valid()) {
+std::optional<RegisteredExecutables::Found> RegistryWatches::watchExecutable(const std::string& path,
+                                                                             RegisteredExecutables& executables) {
+    auto found = executables.watch(path, inotify_, nameEvents | IN_MASK_ADD, silent_ > 0 ? patienceAfterOne : patience);
+    if (!found || !found->watchedAll)
         complete_ = false;
-        return;
+    if (!found) {
+        ++silent_;
+        return found;
     }
-    if (Interest* const interest = watch(parent.get(), nameEvents, Noticed::executables))
-        interest->names.insert(path.substr(slash + 1));
+    for (const RegisteredExecutables::Watch& watch : found->watches) {
+        Interest& interest = interestsNew_[watch.number];
+        interest.kind = std::max(interest.kind, Noticed::executables);
+        interest.names.insert(watch.name);
+    }
+    return found;
 }
 
 } // namespace zor::platform

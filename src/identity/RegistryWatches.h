@@ -3,11 +3,14 @@
 // that the registered executables lie in. One thread at a time.
 #pragma once
 
+#include "identity/RegisteredExecutables.h"
 #include "os/FileDescriptor.h"
 #include "os/SystemRoot.h"
 
 #include <cstdint>
 #include <map>
+#include <memory>
+#include <optional>
 #include <set>
 #include <string>
 #include <string_view>
@@ -20,7 +23,7 @@ public:
     explicit RegistryWatches(const SystemRoot& root);
 
     /// Readable when there are notices; -1 when the system gave none.
-    [[nodiscard]] int descriptor() const { return inotify_.get(); }
+    [[nodiscard]] int descriptor() const { return inotify_->get(); }
     /// False when a change may come without a notice.
     [[nodiscard]] bool isComplete() const { return complete_; }
 
@@ -35,7 +38,9 @@ public:
     // Watches that are in both sets never pause.
     void begin();
     void watchRegistry();
-    void watchExecutable(const std::string& path);
+    /// The regular file at the path, as it is once changes of it are told. None: its file system does not answer.
+    std::optional<RegisteredExecutables::Found> watchExecutable(const std::string& path,
+                                                                RegisteredExecutables& executables);
     void end();
 
 private:
@@ -47,15 +52,17 @@ private:
     };
 
     [[nodiscard]] Interest* watch(int directory, std::uint32_t events, Noticed kind);
-    void watchNameAt(const std::string& path);
     [[nodiscard]] Noticed judge(const inotify_event& event, std::string_view name) const;
     void followWriters(const inotify_event& event, std::string_view name);
 
     const SystemRoot& root_;
-    FileDescriptor inotify_;
+    /// Shared with looks that may not come back.
+    std::shared_ptr<const FileDescriptor> inotify_;
     bool complete_ = true;
     std::map<int, Interest> interests_;
     std::map<int, Interest> interestsNew_;
+    /// Paths in the set that is being made whose file system did not answer.
+    unsigned silent_ = 0;
     std::set<std::string, std::less<>> beingWritten_;
 };
 

@@ -44,6 +44,16 @@ std::expected<FileDescriptor, int> resolve(int directory, const char* path, int 
     }
 }
 
+std::expected<FileDescriptor, int> remembered(int directory, const char* path, int flags, std::uint64_t rules) {
+    open_how how{};
+    how.flags = static_cast<std::uint64_t>(static_cast<unsigned>(flags | O_PATH | O_CLOEXEC));
+    how.resolve = rules | RESOLVE_CACHED;
+    const long fd = ::syscall(SYS_openat2, directory, path, &how, sizeof how);
+    if (fd >= 0)
+        return FileDescriptor(static_cast<int>(fd));
+    return std::unexpected(errno == EINVAL ? EAGAIN : errno);
+}
+
 bool hasParentComponent(std::string_view path) {
     return path == ".." || path.starts_with("../") || path.ends_with("/..") || path.find("/../") != path.npos;
 }
@@ -63,13 +73,11 @@ std::expected<FileDescriptor, int> openBeneathOnMount(int directory, const char*
 }
 
 std::expected<FileDescriptor, int> openBeneathRemembered(int directory, const char* relativePath, int flags) {
-    open_how how{};
-    how.flags = static_cast<std::uint64_t>(static_cast<unsigned>(flags | O_PATH | O_CLOEXEC));
-    how.resolve = RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS | RESOLVE_CACHED;
-    const long fd = ::syscall(SYS_openat2, directory, relativePath, &how, sizeof how);
-    if (fd >= 0)
-        return FileDescriptor(static_cast<int>(fd));
-    return std::unexpected(errno == EINVAL ? EAGAIN : errno);
+    return remembered(directory, relativePath, flags, RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS);
+}
+
+std::expected<FileDescriptor, int> openRemembered(const char* path) {
+    return remembered(AT_FDCWD, path, 0, 0);
 }
 
 std::expected<FileDescriptor, int> openInRoot(int directory, const char* relativePath, int flags) {

@@ -31,6 +31,9 @@ namespace zor::platform {
 [[nodiscard]] std::expected<FileDescriptor, int> openBeneathRemembered(int directory, const char* relativePath,
                                                                        int flags);
 
+/// The same for a whole path, whose links are followed.
+[[nodiscard]] std::expected<FileDescriptor, int> openRemembered(const char* path);
+
 /// The same as openBeneath for trees that only root writes to, such as DIR/etc: links are followed, as if `directory`
 /// were "/".
 [[nodiscard]] std::expected<FileDescriptor, int> openInRoot(int directory, const char* relativePath, int flags);

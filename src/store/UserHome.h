@@ -12,8 +12,8 @@
 #include "base/FileURL.h"
 #include "base/Log.h"
 #include "base/Mutex.h"
-#include "fs/BoundedQuestion.h"
 #include "fs/PathResolver.h"
+#include "os/BoundedQuestion.h"
 #include "platform/Device.h"
 
 #include <atomic>
@@ -25,7 +25,7 @@
 namespace zor {
 
 /// Leads to a home's path without links, or to an errno.
-using HomeQuestion = fs::BoundedQuestion<std::expected<std::string, int>>;
+using HomeQuestion = platform::BoundedQuestion<std::expected<std::string, int>>;
 
 class UserHome {
 public:

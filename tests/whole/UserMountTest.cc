@@ -77,6 +77,9 @@ TEST(UserMount, KeepsNobodyWaiting) {
     for (const Row& row : rows) {
         SCOPED_TRACE(std::string(row.below) + " served by " + std::to_string(row.server));
         DaemonProcess daemon;
+        // An entry may name a program of the user's.
+        daemon.registerProgram("05-own", daemon.path("private/var/mobile/tool"), "");
+        writeFile(daemon.path("private/var/mobile/tool"), "x");
         daemon.start();
         const auto made = daemon.client().createOrLookup(dataContainer("app")).value();
         ASSERT_TRUE(serves(daemon, second));

@@ -151,7 +151,7 @@ int registryWho(const zorvane::ConnectOptions& connect, const Output& output, co
     const auto root = SystemRoot::open(connect.root);
     if (!root)
         return cannotOpenRoot(output, connect.root, root.error(), what);
-    const auto wanted = zor::platform::IdentityRegistry::executableAt(executable);
+    const auto wanted = zor::platform::RegisteredExecutables().fileAt(executable);
     if (!wanted)
         return output.localError(exitNotFound, printable(executable) + " is no file",
                                  "name an executable, not a script: the program that runs a script is known", what);

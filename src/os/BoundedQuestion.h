@@ -18,18 +18,18 @@
 #include <system_error>
 #include <thread>
 
-namespace zor::fs {
+namespace zor::platform {
 
 /// All questions of an object are the same one, so that one's answer is as good as another's.
 template <typename Answer>
 class BoundedQuestion {
 public:
     /// Runs `question` on another thread, or waits for the one that is under way unless somebody has already waited in
-    /// vain. None: it has not come back within `patience`, or no thread could be had. Any thread.
+    /// vain. None: it has not come back within `patience`, or there was no thread or no memory for it. Any thread.
     std::optional<Answer> ask(std::function<Answer()> question, std::chrono::milliseconds patience) {
         State& state = *state_;
-        const platform::BlockingScope blocking;
-        const platform::MutexLock held(state.mutex);
+        const BlockingScope blocking;
+        const MutexLock held(state.mutex);
         if (state.late || (!state.underWay && !begin(std::move(question))))
             return std::nullopt;
         const std::uint64_t answersBefore = state.answers;
@@ -48,8 +48,8 @@ public:
 
 private:
     struct State {
-        platform::Mutex mutex;
-        platform::ConditionVariable ended;
+        Mutex mutex;
+        ConditionVariable ended;
         bool underWay ZOR_GUARDED_BY(mutex) = false;
         /// Somebody gave up waiting for the question that is under way.
         bool late ZOR_GUARDED_BY(mutex) = false;
@@ -60,9 +60,14 @@ private:
     bool begin(std::function<Answer()> question) ZOR_REQUIRES(state_->mutex) {
         try {
             std::thread([state = state_, question = std::move(question)]() mutable {
-                Answer answer = question();
+                std::optional<Answer> answer;
+                try {
+                    answer.emplace(question());
+                } catch (...) {
+                    answer.reset(); // memory ran out: nothing is known
+                }
                 question = nullptr; // who waits finds nothing held any more by what was asked
-                const platform::MutexLock held(state->mutex);
+                const MutexLock held(state->mutex);
                 state->answer = std::move(answer);
                 ++state->answers;
                 state->underWay = state->late = false;
@@ -79,4 +84,4 @@ private:
     const std::shared_ptr<State> state_ = std::make_shared<State>();
 };
 
-} // namespace zor::fs
+} // namespace zor::platform
