@@ -8,21 +8,17 @@
 #include "support/PowerCut.h"
 #include "support/ProcessResources.h"
 
-#include <filesystem>
-#include <fstream>
 #include <gtest/gtest.h>
-#include <sstream>
 #include <unistd.h>
 
 namespace zor::support {
 namespace {
 
-namespace files = std::filesystem;
-
 constexpr const char* bundleUuid = "11111111-0000-4000-8000-000000000000";
 constexpr const char* wellknownUuid = "22222222-0000-4000-8000-000000000000";
 constexpr const char* dataUuid = "33333333-0000-4000-8000-000000000000";
 constexpr const char* unentitledUuid = "44444444-0000-4000-8000-000000000000";
+const std::string systemPlace = std::string(test::sharedPath) + "/Data/System";
 
 /// A container as an older system left it, with a file that tells it from others.
 void put(const test::World& world, const std::string& path, const plist::Dictionary& metadata,
@@ -37,20 +33,13 @@ void put(const test::World& world, const std::string& path, const plist::Diction
          "no content");
 }
 
-std::string textOf(const files::path& path) {
-    std::ostringstream text;
-    text << std::ifstream(path, std::ios::binary).rdbuf();
-    return text.str();
-}
-
 struct OldDevice {
     explicit OldDevice(platform::Disk& ofTheBoot) : disk(ofTheBoot), device("/dev/shm") {
         device.marker.make();
         device.start(disk, journalEverywhere);
-        const std::string key(entitlementKeys::systemContainer);
-        EXPECT_TRUE(device.daemon->entitlements()._setEntitlementDictionaryValues({plist::Dictionary{{key, true}}},
-                                                                                  {"com.veltra.settingsd"}));
-        const test::World& world = device.daemon->world;
+        test::World& world = device.daemon->world;
+        must(world.entitle("com.veltra.settingsd", entitlements({}, {}, true)) == ErrorCode::success,
+             "no entitlements");
         const std::vector<const char*> inData = {"Documents", "Library", "Library/Caches", "Library/Preferences",
                                                  "tmp"};
         plist::Dictionary data = test::metadataOf(2, mobileUser, "com.example.data", dataUuid);
@@ -60,10 +49,9 @@ struct OldDevice {
             test::metadataOf(1, mobileUser, "com.example.bundle", bundleUuid));
         put(world, test::applications + "/" + dataUuid, data, inData);
         put(world, test::applications + "/Junk", test::metadataOf(2, mobileUser, "junk"), inData);
-        const std::string system = std::string(test::sharedPath) + "/Data/System/";
         for (const auto& [uuid, identifier] :
              {std::pair(wellknownUuid, "com.veltra.settingsd"), std::pair(unentitledUuid, "com.example.unentitled")})
-            put(world, system + uuid, test::metadataOf(12, systemUser, identifier, uuid), inData, 0777);
+            put(world, systemPlace + "/" + uuid, test::metadataOf(12, systemUser, identifier, uuid), inData, 0777);
         device.daemon.reset();
         device.marker.forget();
     }
@@ -84,15 +72,15 @@ std::uint64_t changesOf(StoreDaemon& daemon) {
 /// and whole: the migration is not made again for its sake.
 enum class Bundle { known, inPlace };
 std::string judgeMigrated(const std::string& root, StoreDaemon& daemon, Bundle expected) {
-    const files::path var = root + "/private/var";
-    if (textOf(var / "containers/Bundle/Application" / bundleUuid / "content") != "com.example.bundle" ||
-        files::exists(var / "mobile/Containers/Bundle"))
+    const TestRoot at("", root);
+    if (at.read("private/var/containers/Bundle/Application/" + std::string(bundleUuid) + "/content") !=
+            "com.example.bundle" ||
+        at.exists(std::string(test::mobileContainers) + "/Bundle"))
         return "the bundle is not where it belongs";
-    if (textOf(var / "containers/Data/System/com.veltra.settingsd/content") != "com.veltra.settingsd")
-        return "the well-known container is not under its name";
-    if (files::exists(var / "containers/Data/System" / unentitledUuid))
-        return "an unentitled system container is still there";
-    if (files::exists(var / "mobile/Containers/Data/Application/Junk"))
+    if (at.names(systemPlace) != std::vector<std::string>{"com.veltra.settingsd"} ||
+        at.read(systemPlace + "/com.veltra.settingsd/content") != "com.veltra.settingsd")
+        return "system containers are not what they have to be";
+    if (at.exists(test::applications + "/Junk"))
         return "an orphan is still there";
     const auto groups = daemon.entitlements().appGroupIdentifiersForIdentifier("com.example.data");
     if (!groups || *groups != std::vector<std::string>{"group.old"})
@@ -109,9 +97,9 @@ std::string judgeMigrated(const std::string& root, StoreDaemon& daemon, Bundle e
 
 /// Only one error that hits the bundle's owner may leave that as it was; then the migration counts as done beside it.
 Bundle expectationAfter(const OldDevice& old, const FaultOutcome& outcome) {
-    const files::path var = old.device.root.path() + "/private/var";
-    const bool done = files::exists(var / "root/Library/Zorvane/zor_bundle_migration_complete.plist");
-    const files::path place = var / "containers/Bundle/Application" / bundleUuid;
+    const std::string var = old.device.root.path() + "/private/var";
+    const bool done = test::isThere(var + "/root/Library/Zorvane/zor_bundle_migration_complete.plist");
+    const std::string place = var + "/containers/Bundle/Application/" + bundleUuid;
     struct stat status{};
     const bool asItWas = ::lstat(place.c_str(), &status) == 0 && status.st_uid == mobileUser;
     const bool oneError = !outcome.stopped && outcome.fault.span == FaultSpan::once;

@@ -13,6 +13,8 @@ namespace zor::support {
 
 namespace {
 
+using test::nameOf;
+
 // What changes a container that is there. Its identifier, and the file that tells its content from another's.
 const Request changed{"com.example.changed", ContainerClass::dataApplication, mobileUser};
 constexpr const char* contentName = "content";
@@ -68,9 +70,6 @@ struct Changed {
     std::string uuid;
     std::string name; // of the directory
 };
-std::string nameOf(const std::string& path) {
-    return path.substr(path.rfind('/') + 1);
-}
 Changed look(const std::string& root, bool transient = false) {
     const StoreFindings findings = judgeStore(readTree(root, {"run"}), Transients::judged);
     const auto* found =
@@ -171,42 +170,26 @@ StoppedReplace stopAfterFirstMove(Device& device, const Acknowledged& old, OldOn
     return {.newUrl = journal.newUrl, .destUrl = journal.destUrl};
 }
 
-/// A launch that finds a replace whose first move was made. Whatever stops it, a later one puts the old one back.
-Scenario recovery(const std::string& name, OldOne kind) {
-    return changing(
-        "recovery of a " + name,
-        [=](Device& device, const Acknowledged& old) { stopAfterFirstMove(device, old, kind); },
-        [](Device& device, const Acknowledged&) {
-            device.daemon->launch();
-            return true;
-        },
-        [](const std::string& root, bool, const Acknowledged& old) -> std::string {
-            const Changed now = look(root);
-            return now.content == "old" && now.name == nameOf(old.path) && now.uuid == old.uuid
-                       ? ""
-                       : "the content is " + now.content;
-        });
-}
-
-/// A launch that finds both moves made, the second by a daemon that was killed before it synced it. Where the power
-/// undoes that move, the old one must not be on death row without a journal.
-Scenario recoveryOfADone(const std::string& name, OldOne kind) {
+/// A launch that finds a replace whose first move was made: whatever stops it, a later one puts the old one back. Or
+/// one that finds both moves made, the second by a daemon that was killed before it synced it: where the power undoes
+/// that move, the old one must not be on death row without a journal.
+Scenario recovery(const std::string& name, OldOne kind, bool isDone = false) {
     const auto stopped = std::make_shared<StoppedReplace>();
-    return changing(
-        "recovery of a done " + name,
-        [=](Device& device, const Acknowledged& old) { *stopped = stopAfterFirstMove(device, old, kind); },
-        [=](Device& device, const Acknowledged&) {
-            if (device.daemon->world.services().defaultManager().moveItemAtURL(stopped->newUrl, stopped->destUrl))
-                device.daemon->launch();
-            return true;
-        },
-        [=](const std::string& root, bool, const Acknowledged& old) -> std::string {
-            const Changed now = look(root);
-            const bool otherUuid = now.uuid != old.uuid && (now.content == "old" || kind != OldOne::replaced);
-            return (now.content == "old" || now.content == "new") && !otherUuid
-                       ? ""
-                       : "the content is " + now.content + " under " + now.uuid;
-        });
+    return changing((isDone ? "recovery of a done " : "recovery of a ") + name,
+                    [=](Device& device, const Acknowledged& old) { *stopped = stopAfterFirstMove(device, old, kind); },
+                    [=](Device& device, const Acknowledged&) {
+                        if (!isDone || device.daemon->world.services().defaultManager().moveItemAtURL(stopped->newUrl,
+                                                                                                      stopped->destUrl))
+                            device.daemon->launch();
+                        return true;
+                    },
+                    [=](const std::string& root, bool, const Acknowledged& old) -> std::string {
+                        const Changed now = look(root);
+                        const bool isOld = now.content == "old" && now.name == nameOf(old.path) && now.uuid == old.uuid;
+                        const bool isNew =
+                            isDone && now.content == "new" && (now.uuid == old.uuid) == (kind != OldOne::replaced);
+                        return isOld || isNew ? "" : "the content is " + now.content + " under " + now.uuid;
+                    });
 }
 
 Scenario structure() {
@@ -305,8 +288,8 @@ std::vector<Scenario> changeScenarios() {
             replacement("replace of nothing", OldOne::none),
             atHome(recovery(replace, OldOne::replaced)),
             recovery(keeping, OldOne::replacedAndUuidKept),
-            atHome(recoveryOfADone(replace, OldOne::replaced)),
-            recoveryOfADone(keeping, OldOne::replacedAndUuidKept),
+            atHome(recovery(replace, OldOne::replaced, true)),
+            recovery(keeping, OldOne::replacedAndUuidKept, true),
             wiping(),
             structure(),
             infoValue(),

@@ -12,16 +12,10 @@ namespace {
 
 const std::string app = "com.example.app";
 
-bool registerApp(Device& device, const std::string& identifier, const plist::Dictionary& entitlements,
-                 const plist::Dictionary& options = {}) {
-    const ErrorCode code = device.daemon->world.services().store().entitlementChange.processEntitlements(
-        &entitlements, &identifier, &options);
-    return code == ErrorCode::success;
-}
-
 void mustRegister(Device& device, const std::string& identifier, const plist::Dictionary& entitlements,
                   const plist::Dictionary& options = {}) {
-    must(registerApp(device, identifier, entitlements, options), "a registration before the first fault failed");
+    must(device.daemon->world.entitle(identifier, entitlements, options) == ErrorCode::success,
+         "a registration before the first fault failed");
 }
 
 plist::Dictionary groupsAndSystemContainer() {
@@ -129,7 +123,9 @@ Scenario release() {
     Scenario scenario = going(
         "release by a registration", victims,
         [](Device& device) { mustRegister(device, app, groupsAndSystemContainer()); },
-        [](Device& device, const Victims&) { return registerApp(device, app, {{"k", 1}}); });
+        [](Device& device, const Victims&) {
+            return device.daemon->world.entitle(app, plist::Dictionary{{"k", 1}}) == ErrorCode::success;
+        });
     scenario.also = [judge = scenario.also](const std::string& root, bool acted) -> std::string {
         std::string complaint = judge(root, acted);
         LaterDaemon later(root);

@@ -26,26 +26,15 @@ void makeLeftover(Device& device, const std::string& parent, const char* name) {
     must(made && device.disk->write(file.get(), bytesOf("x")) == 0, "no leftover");
 }
 
-/// Shared and system containers that no identifier is entitled to go at the next boot.
-void entitle(Device& device, const std::vector<Request>& requests) {
-    plist::Array appGroups;
-    plist::Array systemGroups;
-    std::vector<plist::Dictionary> values;
-    std::vector<std::string> identifiers;
-    for (const Request& request : requests) {
-        if (request.containerClass == ContainerClass::dataSystem) {
-            values.push_back(entitlements({}, {}, true));
-            identifiers.push_back(request.identifier);
-        }
-        if (request.containerClass == ContainerClass::sharedAppGroup)
-            appGroups.emplace_back(request.identifier);
-        if (request.containerClass == ContainerClass::sharedSystemGroup)
-            systemGroups.emplace_back(request.identifier);
-    }
-    values.push_back(entitlements(std::move(appGroups), std::move(systemGroups)));
-    identifiers.emplace_back("com.example.groups");
-    must(device.daemon->entitlements()._setEntitlementDictionaryValues(values, identifiers).has_value(),
-         "no entitlements");
+/// A shared or system container that no identifier is entitled to goes at the next boot.
+void entitle(Device& device, const Request& request) {
+    const auto namedBy = [&](ContainerClass containerClass) {
+        return request.containerClass == containerClass ? plist::Array{request.identifier} : plist::Array{};
+    };
+    const auto entitled =
+        entitlements(namedBy(ContainerClass::sharedAppGroup), namedBy(ContainerClass::sharedSystemGroup),
+                     request.containerClass == ContainerClass::dataSystem);
+    must(device.daemon->world.entitle(request.identifier, entitled) == ErrorCode::success, "no entitlements");
 }
 
 Scenario scenarioOf(const std::string& name, std::function<void(Device&)> prepare, std::function<void(Device&)> act,
@@ -60,7 +49,7 @@ Scenario creation(const std::string& name, ContainerClass containerClass, std::u
         "creation of a " + name + " container",
         [request](Device& device) {
             device.create({"com.example.first", ContainerClass::dataApplication, mobileUser});
-            entitle(device, {request});
+            entitle(device, request);
         },
         [request](Device& device) { device.create(request); }, {request});
     scenario.afterOneError = [](const std::string& root) -> std::string {
@@ -129,9 +118,7 @@ Scenario deathRow() {
 }
 
 bool saveGroup(Device& device, const std::string& group) {
-    return device.daemon->entitlements()
-        ._setEntitlementDictionaryValues({entitlements({plist::Value(group)})}, {"com.example.app"})
-        .has_value();
+    return device.daemon->world.entitle("com.example.app", entitlements({group})) == ErrorCode::success;
 }
 
 std::string judgeEntitlements(const std::string& root, bool acted) {

@@ -5,14 +5,12 @@
 #include "support/FaultLoop.h"
 #include "support/Files.h"
 #include "support/PowerCut.h"
-#include "support/ProcessResources.h"
 
 #include <algorithm>
 #include <csignal>
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/resource.h>
-#include <thread>
 #include <unistd.h>
 
 namespace zor::support {
@@ -75,23 +73,6 @@ std::string text(const Bytes& bytes) {
     return {bytes.begin(), bytes.end()};
 }
 
-// Goal: a leak is seen. Method: hold a descriptor and a thread.
-TEST(ProcessResourcesTest, SeesLeaks) {
-    const ProcessResources before;
-    {
-        const FileDescriptor held(::open("/dev/null", O_RDONLY | O_CLOEXEC));
-        EXPECT_NE(before.leakedSince().find("/dev/null"), std::string::npos);
-    }
-    std::jthread waiting([](const std::stop_token& stop) {
-        while (!stop.stop_requested())
-            std::this_thread::yield();
-    });
-    EXPECT_EQ(before.leakedSince(), "1 threads; ");
-    waiting.request_stop();
-    waiting.join();
-    EXPECT_EQ(before.leakedSince(), "");
-}
-
 // Goal: protocols that are known to be wrong are caught and sound ones pass, each under the model that can tell.
 // Method: a table of step lists, recorded on a real directory; after a cut "f" must hold the old or, when acknowledged,
 // the new content, with its mode.
@@ -101,8 +82,7 @@ struct Protocol {
     bool soundOrdered;
     bool soundUnordered;
 };
-
-const std::vector<Protocol> protocols = {
+const Protocol protocols[] = {
     {"nothing synced", {createTemporary, writeNew, renameOver}, false, false},
     {"sound", {createTemporary, writeNew, syncFile, renameOver, syncDirectory}, true, true},
     {"file not synced", {createTemporary, writeNew, renameOver, syncDirectory}, false, false},
@@ -114,19 +94,6 @@ const std::vector<Protocol> protocols = {
     {"mode after sync", {createClosed, writeNew, syncFile, setMode, renameOver, syncDirectory}, true, false},
     {"file system synced", {createClosed, writeNew, setMode, syncAll, renameOver, syncAll}, true, true},
 };
-
-/// Whether no cut leaves what `judge` complains of, under each model.
-using Judge = std::string (*)(const PowerCutState&, const std::string&);
-void expectSound(const DiskLog& log, Judge judge, bool soundOrdered, bool soundUnordered) {
-    for (const std::uint64_t seed : {1, 2, 3}) {
-        for (const DiskModel model : {DiskModel::orderedJournal, DiskModel::unordered}) {
-            const LoopReport report = forEachPowerCut(log, {.model = model, .seed = seed}, judge);
-            EXPECT_EQ(report.complaint.empty(), model == DiskModel::unordered ? soundUnordered : soundOrdered)
-                << report.complaint;
-            EXPECT_GT(report.examined, 0U);
-        }
-    }
-}
 
 std::string judgeReplacement(const PowerCutState& state, const std::string& directory) {
     const FileTree tree = readTree(directory);
@@ -156,7 +123,14 @@ TEST(PowerCutModelTest, TellsSoundFromWrong) {
         ASSERT_EQ(runSteps(disk, directory.get(), protocol.steps), 0);
         disk.mark();
         ASSERT_EQ(disk.complaint(), "");
-        expectSound(disk.log(), judgeReplacement, protocol.soundOrdered, protocol.soundUnordered);
+        for (const std::uint64_t seed : {1, 2, 3})
+            for (const DiskModel model : {DiskModel::orderedJournal, DiskModel::unordered}) {
+                const auto report = forEachPowerCut(disk.log(), {.model = model, .seed = seed}, judgeReplacement);
+                EXPECT_EQ(report.complaint.empty(),
+                          model == DiskModel::unordered ? protocol.soundUnordered : protocol.soundOrdered)
+                    << report.complaint;
+                EXPECT_GT(report.examined, 0U);
+            }
     }
 }
 

@@ -1,52 +1,45 @@
 // SPDX-License-Identifier: Apache-2.0
-// The daemon's life: its log, the work of a boot, the lock state, what a failed service does to it; the command line.
+// The daemon's life: its log, the work of a boot, the lock state, what a failed service does to it.
 #include "daemon/Daemon.h"
-#include "daemon/Options.h"
 #include "world/World.h"
 
 #include <algorithm>
 #include <filesystem>
-#include <future>
 #include <gtest/gtest.h>
 #include <unistd.h>
 
 namespace zor::test {
 namespace {
 
-using support::LogLine;
-
 // Goal: a boot's work runs once, again without a marker of the daemon's own; a launch's each time. Method: launches
 // over one disk.
 TEST(DaemonLife, TheWorkOfABootRunsOnce) {
     struct Row {
-        const char* name;
         platform::BootMarker::State marker;
         int makeError;
         bool boots;
     };
-    const Row rows[] = {
-        {"first", {}, 0, true},
-        {"second", {.present = true}, 0, false},
-        {"marker cannot be made", {}, EACCES, true},
-        {"foreign", {.present = false, .foreign = true}, 0, true},
-    };
     World world;
     const std::string temporary = std::string(cachesPath) + "/Temp/Data/System/x";
-    for (const Row& row : rows) {
-        SCOPED_TRACE(row.name);
-        world.bootMarker.state = row.marker;
-        world.bootMarker.makeError = row.makeError;
+    for (const auto& [marker, makeError, boots] :
+         {Row{{}, 0, true}, Row{{.present = true}, 0, false}, Row{{}, EACCES, true},
+          Row{{.present = false, .foreign = true}, 0, true}}) {
+        SCOPED_TRACE(std::to_string(marker.present) + std::to_string(marker.foreign) + std::to_string(makeError));
+        world.bootMarker.state = marker;
+        world.bootMarker.makeError = makeError;
         world.makeDirectories(temporary);
         world.makeDirectories(staging + "/x");
         world.restart();
+        (void)world.find("app");
+        EXPECT_EQ(world.services().cache().counts().classCaches, 1U);
         world.log.take();
         Daemon(world.services(), {}).setUp();
         world.drainDeathRow();
-        EXPECT_EQ(world.exists(temporary), !row.boots);
-        EXPECT_FALSE(world.exists(staging + "/x"));
-        EXPECT_TRUE(world.names(dead).empty());
-        EXPECT_EQ(world.complaints("main").size(), row.marker.foreign ? 1U : 0U);
-        EXPECT_EQ(world.bootMarker.state.present, row.makeError == 0);
+        EXPECT_EQ(world.services().cache().counts().classCaches, 0U); // what a setup found is not kept
+        EXPECT_EQ(world.exists(temporary), !boots);
+        EXPECT_TRUE(world.names(staging).empty() && world.names(dead).empty());
+        EXPECT_EQ(world.complaints("main").size(), marker.foreign ? 1U : 0U);
+        EXPECT_EQ(world.bootMarker.state.present, makeError == 0);
     }
 }
 
@@ -67,9 +60,8 @@ TEST(DaemonLife, ClosesItsHome) {
             continue; // another's cannot be made
         SCOPED_TRACE(before);
         World world;
-        if (before == 0)
-            std::filesystem::remove_all(world.path(home));
-        else
+        std::filesystem::remove_all(world.path(home));
+        if (before != 0)
             world.makeDirectories(home, owner, before);
         world.bootMarker.state.present = true;
         world.services().configuration().logDirectory();
@@ -77,7 +69,7 @@ TEST(DaemonLife, ClosesItsHome) {
         Daemon(world.services(), {}).setUp();
         EXPECT_EQ(world.item(home), directoryOf(owner, after));
         const auto lines = world.log.take();
-        const auto line = std::ranges::find_if(lines, [](const LogLine& one) { return one.function == "main"; });
+        const auto line = std::ranges::find(lines, "main", &support::LogLine::function);
         EXPECT_EQ(line == lines.end() ? 0 : line->level, said);
     }
 }
@@ -101,21 +93,6 @@ TEST(DaemonLife, FollowsTheLockState) {
         EXPECT_EQ(world.lockStateQueue.suspended, suspended) << state;
         EXPECT_EQ(world.lockStateQueue.resumed, resumed) << state;
     }
-    // What is queued while locked runs after the unlock.
-    world.lockState.state = 1;
-    daemon.evaluateLockState();
-    std::promise<void> ran;
-    auto future = ran.get_future();
-    world.lockStateQueue.async([&] { ran.set_value(); });
-    EXPECT_EQ(future.wait_for(std::chrono::milliseconds(30)), std::future_status::timeout);
-    world.lockState.state = 0;
-    daemon.evaluateLockState();
-    EXPECT_EQ(future.wait_for(std::chrono::seconds(10)), std::future_status::ready);
-
-    World failing;
-    failing.lockState.registrationStatus = 28;
-    Daemon(failing.services(), {}).followLockState();
-    EXPECT_EQ(failing.log.take(), (std::vector<LogLine>{{3, "main", "register failed for lockstate: 28"}}));
 }
 
 // Goal: a launch serves when it says that it is ready, is busy until then, and ends when told; without the listener it
@@ -148,47 +125,6 @@ TEST(DaemonLife, RunsUntilToldToStop) {
         EXPECT_EQ(world.complaints("main").size(), blocked == Blocked::nothing ? 0U : 1U);
         EXPECT_EQ(world.bootMarker.state.present, blocked != Blocked::queue);
     }
-}
-
-// Goal: every command line ends in options or in a text with its exit status. Method: a table.
-TEST(Options, CommandLine) {
-    const auto parse = [](std::vector<std::string> texts) {
-        texts.insert(texts.begin(), "zorvaned");
-        std::vector<char*> arguments;
-        for (std::string& text : texts)
-            arguments.push_back(text.data());
-        arguments.push_back(nullptr);
-        return parseDaemonOptions(static_cast<int>(texts.size()), arguments.data());
-    };
-    struct Row {
-        std::vector<std::string> arguments;
-        int status;
-        const char* text;
-    };
-    const Row rows[] = {
-        {{"--root"}, 2, "option '--root' needs a value"},
-        {{"--log-level", "8"}, 2, "log level '8' is not a number from 0 to 7"},
-        {{"--log-level", ""}, 2, "log level '' is not"},
-        {{"--nonsense"}, 2, "unknown option '--nonsense'"},
-        {{"--", "start"}, 2, "unexpected argument 'start'"},
-        {{"--help", "--nonsense"}, 0, "Usage: zorvaned"},
-        {{"--version"}, 0, "zorvaned "},
-    };
-    for (const Row& row : rows) {
-        const auto options = parse(row.arguments);
-        ASSERT_FALSE(options) << row.text;
-        EXPECT_EQ(options.error().exitStatus, row.status) << row.text;
-        EXPECT_NE(options.error().text.find(row.text), std::string::npos) << options.error().text;
-    }
-    const auto shown = [&](const std::vector<std::string>& arguments) {
-        const auto options = parse(arguments).value();
-        return options.rootDirectory + " " + std::to_string(options.logLevel) +
-               (options.foreground ? " foreground" : "") + (options.forgetBoot ? " forget" : "");
-    };
-    EXPECT_EQ(shown({}), "/ 5");
-    EXPECT_EQ(shown({"--root", "/tmp/x", "--log-level", "7"}), "/tmp/x 7");
-    EXPECT_EQ(shown({"--root=/tmp/x", "--log-level=0"}), "/tmp/x 0");
-    EXPECT_EQ(shown({"--foreground", "--forget-boot"}), "/ 5 foreground forget");
 }
 
 } // namespace

@@ -81,21 +81,18 @@ TEST_F(DeathRow, WhatCannotBeRemoved) {
     world.disk().arm(stuck);
     EXPECT_EQ(world.pass(), ErrorCode::deathRowItemNotDestroyed);
     EXPECT_EQ(world.names(dead), (Names{"temp.xxxxxx"}));
-    EXPECT_EQ(world.complaints("deleteContainersOnDeathRowWithCompletion").size(), 1U);
     EXPECT_EQ(left(), (Names{world.path(dead + "/temp.xxxxxx")}));
     movesFail = false;
     world.disk().arm(stuck);
-    EXPECT_EQ(world.pass(), ErrorCode::success);
-    EXPECT_TRUE(world.names(dead).empty());
-    EXPECT_TRUE(world.exists("tmp/temp.xxxxxx/bundle/stuck"));
     // Another's directory there is not ours.
     world.makeDirectories("tmp/temp.zzzzzz/precious", 0, 0700);
-    for (const bool restarts : {false, true}) {
-        EXPECT_EQ(world.item("tmp/temp.xxxxxx"), directoryOf(0, 0700));
-        EXPECT_EQ(left(), (Names{world.path("tmp/temp.xxxxxx")}));
+    for (const bool restarts : {false, false, true}) {
         if (restarts)
             world.restart();
         EXPECT_EQ(world.pass(), ErrorCode::success);
+        EXPECT_TRUE(world.names(dead).empty() && world.exists("tmp/temp.xxxxxx/bundle/stuck"));
+        EXPECT_EQ(world.item("tmp/temp.xxxxxx"), directoryOf(0, 0700));
+        EXPECT_EQ(left(), (Names{world.path("tmp/temp.xxxxxx")}));
     }
     world.disk().disarm();
     EXPECT_EQ(world.pass(), ErrorCode::success);
@@ -142,12 +139,9 @@ TEST(DeathRowElsewhere, ContainersGoByARename) {
             return std::this_thread::get_id() == here && ++calls == 0;
         }});
         if (way == Way::askedAgain)
-            EXPECT_EQ(codeOf(world.daemonsClient().createOrLookupContainerForUser(
-                          mobile, &container.record->identifier(), application, {.transient = true})),
-                      ErrorCode::notFound);
+            EXPECT_EQ(codeOf(world.find("app", application, true)), ErrorCode::notFound);
         else if (way == Way::deleted)
-            EXPECT_TRUE(world.daemonsClient().deleteContainerForUser(mobile, &container.record->identifier(),
-                                                                     application, false));
+            EXPECT_EQ(world.stage(container), ErrorCode::success);
         else
             world.daemonsClient().rebootContainerManagerSetup();
         world.disk().disarm();
@@ -200,65 +194,34 @@ TEST_F(DeathRow, AnothersDirectoryInAContainersPlace) {
             const std::string& place = container.path;
             world.makeDirectories("precious", 0, 0700);
             world.makeDirectories("precious/file");
-            const auto swap = [&] {
-                ASSERT_EQ(::rename(place.c_str(), world.path("aside").c_str()), 0);
-                ASSERT_EQ(::rename(world.path("precious").c_str(), place.c_str()), 0);
-            };
-            bool swapped = !meanwhile;
-            if (!meanwhile)
-                swap();
-            world.disk().arm({.filter = [&](const DiskCallInfo& call) {
+            bool swapped = false;
+            const auto swap = [&](const DiskCallInfo& call) {
                 if (!swapped && call.call == DiskCall::rename && call.subject.starts_with(nameOf(place))) {
                     swapped = true;
-                    swap();
+                    world.move(place, "aside");
+                    world.move("precious", place);
                 }
                 return false;
-            }});
-            if (asksAgain) {
+            };
+            if (meanwhile)
+                world.disk().arm({.filter = swap});
+            else
+                swap({.call = DiskCall::rename, .subject = nameOf(place)});
+            if (asksAgain)
                 (void)world.create("app", application, true);
-                world.drainDeathRow();
-            } else {
-                (void)world.daemonsClient().stageForDeleteContainersWithUsers(
-                    ZORClientConnection::DeletionBatch::of(mobile, container.uuid, "app", application),
-                    UseLocking::yes);
-            }
+            else
+                (void)world.stage(container);
+            world.drainDeathRow();
             world.disk().disarm();
             EXPECT_TRUE(swapped);
             EXPECT_EQ(world.pass(), ErrorCode::success);
             EXPECT_TRUE(isThere(place + "/file"));
             EXPECT_EQ(itemAt(place), directoryOf(0, 0700));
-            std::filesystem::remove_all(place);
-            std::filesystem::remove_all(world.path("aside"));
-            std::filesystem::remove_all(world.path(applications));
+            for (const char* left : {"aside", "private/var/mobile/Containers"})
+                std::filesystem::remove_all(world.path(left));
             world.restart();
             world.load();
         }
-}
-
-TEST_F(DeathRow, ADeathRowThatIsNoDirectory) {
-    ASSERT_TRUE(world.services().defaultManager().removeItemAtURL(world.url(dead)));
-    world.write(dead, "a file");
-    EXPECT_EQ(world.pass(), ErrorCode::listForDeletionFailed);
-    EXPECT_EQ(world.read(dead), "a file");
-    ASSERT_EQ(::unlink(world.path(dead).c_str()), 0);
-    EXPECT_EQ(world.pass(), ErrorCode::success);
-    EXPECT_TRUE(world.item(dead).starts_with("directory"));
-}
-
-// Goal: the daemon is busy from the call until the pass has run. Method: the queue stands still.
-TEST_F(DeathRow, APassKeepsTheDaemonBusy) {
-    platform::Platform roles = world.linux().roles();
-    roles.deathRowQueue.suspend();
-    for (const char* item : {"a", "b", "c"}) {
-        world.makeDirectories(item);
-        ASSERT_TRUE(condemn(item, StartDeletionThread::yes));
-    }
-    EXPECT_EQ(roles.transactions.count(), 1U) << "a pass finds all that is there";
-    EXPECT_EQ(world.deathRow(), (Names{"a", "b", "c"}));
-    roles.deathRowQueue.resume();
-    EXPECT_EQ(world.pass(), ErrorCode::success);
-    EXPECT_EQ(roles.transactions.count(), 0U);
-    EXPECT_TRUE(world.names(dead).empty());
 }
 
 } // namespace

@@ -1,7 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // What is asked of one container by its UUID: info values, its record, its structure, its directory's name, its size.
 #include "operations/ZORGroupManager.h"
-#include "store/ZOREntitlementMapping.h"
 #include "support/OpenWatch.h"
 #include "world/World.h"
 
@@ -37,65 +36,55 @@ protected:
 TEST_F(Known, InfoValuesLastOrAreRefused) {
     const Address address = addressOf(world.make("com.example"));
     EXPECT_EQ(codeOf(get(address, "k")), ErrorCode::infoKeyNotFound);
-    EXPECT_TRUE(world.complaints("infoValueForKey").empty());
     const plist::Value kept = plist::Dictionary{{"deep", plist::Array{1, "two"}}};
     ASSERT_TRUE(set(address, "k", kept));
     const std::string gone = "gone";
     ASSERT_TRUE(set(address, gone, "soon"));
     ASSERT_TRUE(client().setInfoValue(nullptr, &gone, address, UseLocking::yes));
-    plist::Value deep(1);
-    for (int level = 0; level < 80; ++level)
-        deep = plist::Array{std::move(deep)};
-    for (const plist::Value& value : {plist::Value(std::string(std::size_t{1} << 20, 'x')), deep}) {
-        EXPECT_EQ(codeOf(set(address, "k", value)), ErrorCode::propertyListNotWritten);
-        EXPECT_EQ(*get(address, "k"), kept);
-    }
+    EXPECT_EQ(codeOf(set(address, "k", std::string(std::size_t{1} << 20, 'x'))), ErrorCode::propertyListNotWritten);
+    EXPECT_EQ(*get(address, "k"), kept);
     world.refuse(DiskCall::write, ENOSPC);
     EXPECT_EQ(codeOf(set(address, "k", "unwritten")), ErrorCode::propertyListNotWritten);
     world.disk().disarm();
     EXPECT_EQ(*get(address, "k"), plist::Value("unwritten"));
     world.restart();
-    EXPECT_EQ(*get(address, "k"), kept);
-    EXPECT_FALSE(get(address, gone));
     const auto metadata = client().metadataForUser(address);
     ASSERT_TRUE(metadata && metadata->info);
-    EXPECT_EQ(metadata->info->size(), 1U);
-    EXPECT_FALSE(metadata->transient);
+    EXPECT_EQ(*metadata->info, (plist::Dictionary{{"k", kept}}));
 }
 
 // Goal: a broken structure is whole again, in the class that is recorded, and no link followed.
 // Method: subdirectories removed, closed, swapped; a recorded class, and a lock that takes it away.
 TEST_F(Known, StructureIsMadeAgain) {
     const FoundContainer container = world.make("com.example");
+    const auto mend = [&] { return codeOf(client().recreateDefaultStructureForUser(addressOf(container))); };
     std::filesystem::remove_all(container.path + "/Library");
-    ASSERT_EQ(::chmod((container.path + "/Documents").c_str(), 0), 0);
-    ASSERT_TRUE(client().recreateDefaultStructureForUser(addressOf(container)));
-    for (const char* subdirectory : {"/Documents", "/Library", "/Library/Caches", "/Library/Preferences", "/tmp"})
-        EXPECT_EQ(itemAt(container.path + subdirectory), directoryOf(mobile)) << subdirectory;
-    ASSERT_TRUE(set(addressOf(container), "com.veltra.Brevance.ContentProtectionClass", 1));
     std::filesystem::remove_all(container.path + "/tmp");
-    const auto classOf = [&](const char* subdirectory) {
-        const auto found = world.services().defaultManager().dataProtectionClassOfItemAtURL(
-            FileURL::directory(container.path + subdirectory));
-        return found.value_or(-1);
-    };
+    ASSERT_EQ(::chmod((container.path + "/Documents").c_str(), 0), 0);
+    ASSERT_TRUE(set(addressOf(container), "com.veltra.Brevance.ContentProtectionClass", 1));
     world.lockState.state = 1;
-    EXPECT_EQ(codeOf(client().recreateDefaultStructureForUser(addressOf(container))), ErrorCode::subdirectoryFailed);
+    EXPECT_EQ(mend(), ErrorCode::subdirectoryFailed);
     EXPECT_FALSE(isThere(container.path + "/tmp"));
     world.lockState.state = 0;
-    ASSERT_TRUE(client().recreateDefaultStructureForUser(addressOf(container)));
-    EXPECT_EQ(classOf("/tmp"), 1);
-    EXPECT_EQ(classOf("/Documents"), 3);
+    ASSERT_EQ(mend(), ErrorCode::success);
+    for (const std::string subdirectory : {"/Documents", "/Library", "/Library/Caches", "/Library/Preferences", "/tmp"})
+        EXPECT_EQ(itemAt(container.path + subdirectory), directoryOf(mobile)) << subdirectory;
+    const auto classOf = [&](const char* subdirectory) {
+        return world.services().defaultManager().dataProtectionClassOfItemAtURL(
+            FileURL::directory(container.path + subdirectory));
+    };
+    EXPECT_EQ(classOf("/tmp").value(), 1);
+    EXPECT_EQ(classOf("/Documents").value(), 3);
     world.makeDirectories("outside", 0, 0700);
     std::filesystem::remove_all(container.path + "/Library");
-    std::filesystem::create_directory_symlink(world.path("outside"), container.path + "/Library");
-    EXPECT_EQ(codeOf(client().recreateDefaultStructureForUser(addressOf(container))), ErrorCode::subdirectoryFailed);
+    world.link(world.path("outside"), container.path + "/Library");
+    EXPECT_EQ(mend(), ErrorCode::subdirectoryFailed);
     EXPECT_EQ(world.item("outside"), directoryOf(0, 0700));
     EXPECT_TRUE(world.names("outside").empty());
 }
 
-// Goal: the directory gets another name, whole or not at all, and the mapping follows the live one.
-// Method: a failing rename, a rename, a restart; before it the same of a transient one.
+// Goal: the directory gets another name, whole or not at all, and the mapping follows the live one. Method: a failing
+// rename, a rename, one whose sync fails, a restart; before it the same of a transient one.
 TEST_F(Known, DirectoryGetsANewName) {
     const FoundContainer container = world.make("com.example");
     const Address address = addressOf(container);
@@ -108,25 +97,21 @@ TEST_F(Known, DirectoryGetsANewName) {
     EXPECT_EQ(client().metadataForUser(address)->path, container.path);
     ASSERT_TRUE(client().regenerateDirectoryUUIDForUser(address));
     const std::string moved = client().metadataForUser(address)->path;
-    EXPECT_NE(moved, container.path);
-    EXPECT_TRUE(UUID::parse(nameOf(moved)));
-    EXPECT_FALSE(isThere(container.path));
+    EXPECT_TRUE(moved != container.path && UUID::parse(nameOf(moved)) && !isThere(container.path));
     EXPECT_EQ(std::filesystem::read_symlink(world.path("run/zorvane/sandbox/501/1/com.example")), moved);
-    // A sync that fails says what happened.
     world.disk().arm({.filter = [](const auto& call) {
         return call.call == DiskCall::sync || call.call == DiskCall::syncFileSystem;
     }});
     const auto renamed = client().regenerateDirectoryUUIDForUser(address);
     world.disk().disarm();
-    ASSERT_EQ(codeOf(renamed), ErrorCode::directoryNotRenamed);
-    const std::string last = client().metadataForUser(address)->path;
-    EXPECT_TRUE(renamed.error().description()->starts_with(last + " is in its place, but a power cut may undo that"));
     world.restart();
-    EXPECT_EQ(client().metadataForUser(address)->path, last);
+    const std::string last = client().metadataForUser(address)->path;
+    EXPECT_TRUE(complaintOf(renamed).find(" " + last + " is in its place, but a power cut may undo that") !=
+                std::string::npos);
 }
 
-// Goal: a bundle is measured once, unless it is being filled; data each time, rubbish over. Method: files added between
-// queries.
+// Goal: a bundle is measured once, unless it is being filled; data each time. Method: files added between queries; a
+// disk on which the size cannot be kept.
 TEST_F(Known, DiskUsageIsKeptForBundlesAlone) {
     const FoundContainer bundle = world.make("com.example", ContainerClass::bundleApplication);
     const FoundContainer data = world.make("com.example");
@@ -143,28 +128,22 @@ TEST_F(Known, DiskUsageIsKeptForBundlesAlone) {
     grow("/zero");
     (void)usage(bundle);
     grow("/one");
-    world.services().store().diskUsage.settledTime = {};
-    const std::uint64_t bundleBytes = usage(bundle);
-    const std::uint64_t dataBytes = usage(data);
-    const std::uint64_t transientBytes = usage(transient);
-    EXPECT_GE(bundleBytes, 200'000U);
-    grow("/two");
-    world.restart();
-    world.services().store().diskUsage.settledTime = {};
-    EXPECT_EQ(usage(bundle), bundleBytes);
-    EXPECT_GE(usage(data), dataBytes + 100'000);
-    EXPECT_GE(usage(transient), transientBytes + 100'000); // it is being filled
-    // On a disk where it cannot be kept it is said, and measured again the next time.
-    for (const bool fails : {false, true}) {
-        ASSERT_TRUE(set(addressOf(bundle), "com.veltra.Brevance.StaticDiskUsage", "rubbish"));
-        if (fails)
-            world.disk().arm({.error = ENOSPC, .span = FaultSpan::fromThenOn});
-        EXPECT_GE(usage(bundle), bundleBytes + 100'000);
+    std::uint64_t bytes[3] = {100'000, 0, 0};
+    for (const bool again : {false, true}) {
+        world.services().store().diskUsage.settledTime = {};
+        std::uint64_t* kept = bytes;
+        for (const FoundContainer& container : {bundle, data, transient}) {
+            const std::uint64_t now = usage(container);
+            EXPECT_EQ(now >= *kept + 100'000, !again || container.path != bundle.path);
+            *kept++ = now;
+        }
+        grow("/two");
+        world.restart();
     }
+    ASSERT_TRUE(set(addressOf(bundle), "com.veltra.Brevance.StaticDiskUsage", "rubbish"));
+    world.disk().arm({.error = ENOSPC, .span = FaultSpan::fromThenOn});
+    EXPECT_GE(usage(bundle), bytes[0] + 100'000);
     world.disk().disarm();
-    EXPECT_EQ(
-        world.complaints("diskUsageForUserId"),
-        std::vector<std::string>{"Error setting info value for userId: 33, identifier: com.example, Class: 1: 34"});
 }
 
 // Goal: a size is not kept for a container that moved while it was measured. Method: a renaming in the moment in which
@@ -189,30 +168,17 @@ TEST_F(Known, ASizeIsNotKeptForWhatMovedMeanwhile) {
     EXPECT_TRUE(get(address, "com.veltra.Brevance.StaticDiskUsage"));
 }
 
-// Goal: the retry test ends the daemon as often as told, and leaves nothing; a deletion that may not last is no
-// success. Method: a child a call, one of them on a failing disk.
+// Goal: the retry test ends the daemon as often as told, and leaves nothing. Method: a child a call.
 TEST_F(Known, RetryTestCountsDown) {
-    enum class End { crashed, succeeded, failed };
-    for (const End end : {End::crashed, End::failed, End::crashed, End::succeeded}) {
-        bool staged = false;
-        if (end == End::failed)
-            world.disk().arm({.error = EIO, .span = FaultSpan::fromThenOn, .filter = [&](const auto& info) {
-                                  staged = staged || (info.call == DiskCall::rename &&
-                                                      info.subject.find("metadata") == std::string::npos);
-                                  return staged && info.call != DiskCall::rename;
-                              }});
+    for (const bool crashes : {true, false}) {
         const pid_t child = ::fork();
         if (child == 0)
-            ::_exit(static_cast<int>(client().retryTestForUser(mobile, 1) ? End::succeeded : End::failed));
+            ::_exit(client().retryTestForUser(mobile, 1) ? 7 : 8);
         int status = -1;
         ::waitpid(child, &status, 0);
-        EXPECT_EQ(WIFEXITED(status) ? static_cast<End>(WEXITSTATUS(status)) : End::failed, end);
-        world.disk().disarm();
-        if (end == End::crashed) {
-            EXPECT_EQ(world.names(applications).size(), 1U);
-        }
+        EXPECT_EQ(WIFEXITED(status) ? WEXITSTATUS(status) : 0, crashes ? 0 : 7);
+        EXPECT_EQ(world.names(applications).size(), crashes ? 1U : 0U);
     }
-    EXPECT_TRUE(world.names(applications).empty());
 }
 
 // Goal: nobody waits for the disk under the lock of all identifiers. Method: whether somebody holds it at each sync
@@ -281,12 +247,18 @@ TEST_F(Known, OperationsRunTogether) {
     world.write(groupMarkerPath, "");
     // Held by one while another comes and goes.
     const plist::Dictionary groups{{std::string(entitlementKeys::applicationGroups), plist::Array{"group"}}};
-    const std::string names[] = {"holder", "other"};
-    ZOREntitlementMapping& mapping = world.services().entitlements();
-    EntitlementChange& change = world.services().store().entitlementChange;
-    ASSERT_EQ(change.processEntitlements(&groups, &names[0], nullptr), ErrorCode::success);
+    const std::string holder = "holder";
+    ASSERT_EQ(world.entitle(holder, groups), ErrorCode::success);
     const std::string group = world.make("group", ContainerClass::sharedAppGroup).path;
     std::atomic<bool> end{false};
+    // Asked for by two at once, each container is made once.
+    constexpr int made = 12;
+    std::atomic<int> makers[made] = {};
+    const auto makeEach = [&](int i) {
+        if (i < made)
+            makers[i] += world.make("id" + std::to_string(i), ContainerClass::dataTempDir).existed ? 0 : 1;
+        (void)world.make("transient", ContainerClass::dataTempDir, asTransient);
+    };
     const std::function<void(int)> operations[] = {
         [&](int) { EXPECT_TRUE(client().regenerateDirectoryUUIDForUser(address)); },
         [&](int i) { EXPECT_TRUE(set(address, "k", i)); },
@@ -296,24 +268,25 @@ TEST_F(Known, OperationsRunTogether) {
         [&](int) { EXPECT_EQ(client().containersForUser(mobile, application, false)->size(), 1U); },
         [&](int) { EXPECT_TRUE(world.find("com.example")); },
         [&](int i) {
-            EXPECT_EQ(change.processEntitlements(i % 2 == 0 ? &groups : nullptr, &names[1], nullptr),
-                      ErrorCode::success);
-            EXPECT_EQ(mapping.entitlementsExistForIdentifier(names[1]), i % 2 == 0);
+            EXPECT_EQ(world.entitle("other", i % 2 == 0 ? std::optional(groups) : std::nullopt), ErrorCode::success);
         },
         [&](int) {
-            EXPECT_EQ(
-                world.services().groups().groupContainerPathsForUser(mobile, client().caller(), &names[0]).value(),
-                (ZORGroupManager::Paths{{"group", group}}));
+            EXPECT_EQ(world.services().groups().groupContainerPathsForUser(mobile, client().caller(), &holder).value(),
+                      (ZORGroupManager::Paths{{"group", group}}));
         },
+        makeEach,
+        makeEach,
     };
     inParallel(static_cast<int>(std::size(operations)), [&](int thread) {
-        for (int i = 0; thread == 0 ? i < 80 : !end; ++i)
+        for (int i = 0; thread == 0 ? i < 80 : !end || i < made; ++i)
             operations[thread](i);
         end = end || thread == 0;
     });
     EXPECT_EQ(world.services().locks().identifiersInUse(), 0U);
-    ASSERT_EQ(change.processEntitlements(nullptr, &names[1], nullptr), ErrorCode::success);
-    ASSERT_EQ(change.processEntitlements(nullptr, &names[0], nullptr), ErrorCode::success);
+    for (const std::atomic<int>& count : makers)
+        EXPECT_EQ(count, 1);
+    for (const char* identifier : {"other", "holder"})
+        ASSERT_EQ(world.entitle(identifier, {}), ErrorCode::success);
     EXPECT_FALSE(isThere(group));
 }
 

@@ -1,10 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the first launch of a boot makes of an older system: its bundles, well-known containers, group identifiers, and
-// system containers that nobody is entitled to.
+// What the first launch of a boot makes of an older system: its bundles, well-known containers and group identifiers.
 #include "daemon/Daemon.h"
 #include "world/World.h"
 
 #include <algorithm>
+#include <filesystem>
 #include <gtest/gtest.h>
 #include <optional>
 #include <stdexcept>
@@ -75,6 +75,7 @@ TEST(Migration, StopsAtTheNextItem) {
                 return false;
             }});
             Daemon(world.services(), {.stopWanted = [&] { return looks++ >= allowed; }}).setUp();
+            EXPECT_EQ(world.services().store().setup.stopped(), looks > allowed);
             world.disk().disarm();
             world.drainDeathRow();
             ASSERT_LT(behind, 12) << "after look " << allowed;
@@ -96,40 +97,29 @@ TEST(Migration, BundlesMoveOnce) {
     putFormerBundle(world, former + "/Application/" + firstUuid, "com.example.app");
     putFormerBundle(world, former + "/Framework/" + secondUuid, "wrong class");
     const auto outcome = migrateBundles(world);
-    EXPECT_TRUE(outcome.succeeded);
-    EXPECT_EQ(outcome.migrated, 1U);
-    ASSERT_TRUE(outcome.error);
-    EXPECT_TRUE(outcome.error->is(ErrorCode::metadataInvalid));
+    EXPECT_TRUE(outcome.succeeded && outcome.migrated == 1);
+    EXPECT_TRUE(outcome.error && outcome.error->is(ErrorCode::metadataInvalid));
     EXPECT_FALSE(world.exists(former));
     const std::string moved = bundles + "/Application/" + firstUuid;
-    EXPECT_EQ(world.item(moved), directoryOf(33));
-    EXPECT_EQ(world.item(bundles + "/Framework/" + secondUuid), directoryOf(33)); // re-owned all the same
+    for (const std::string& directory : {moved, bundles + "/Framework/" + secondUuid}) // re-owned all the same
+        EXPECT_EQ(world.item(directory), directoryOf(33));
     EXPECT_EQ(world.read(moved + "/program"), "code");
     EXPECT_EQ(world.item(metadataIn(moved)), "file 0644 0:0");
     EXPECT_EQ(world.readDictionary(bundleMarker).string("ZORMigrationTime")->size(), 25U);
-
     putFormerBundle(world, former + "/Application/" + secondUuid, "com.example.b");
     world.restart();
     const auto again = migrateBundles(world);
-    EXPECT_TRUE(again.succeeded && !again.error);
-    EXPECT_TRUE(world.exists(former + "/Application/" + secondUuid));
+    EXPECT_TRUE(again.succeeded && !again.error && world.exists(former + "/Application/" + secondUuid));
     EXPECT_EQ(world.find("com.example.app", ContainerClass::bundleApplication)->path, world.path(moved));
 }
 
-// Goal: one that was cut short moves what is left; a copied container's source goes. Method: both places filled.
-TEST(Migration, BundlesJoinThoseThatAreThere) {
+// Goal: a well-known container that finds its name taken stays where it is. Method: something of that name.
+TEST(Migration, ATakenName) {
     World world;
-    const std::string present = bundles + "/Application/" + firstUuid;
-    putFormerBundle(world, present, "com.example.copied");
-    putFormerBundle(world, former + "/Application/" + firstUuid, "source");
-    putFormerBundle(world, former + "/VPNPlugin/" + secondUuid, "com.example.vpn", 5);
-    const auto outcome = migrateBundles(world);
-    EXPECT_TRUE(outcome.succeeded && !outcome.error);
-    EXPECT_EQ(outcome.migrated, 2U);
-    EXPECT_FALSE(world.exists(former));
-    EXPECT_EQ(*world.readDictionary(metadataIn(present)).string("ZORMetadataIdentifier"), "com.example.copied");
-    EXPECT_TRUE(world.exists(bundles + "/VPNPlugin/" + secondUuid + "/program"));
-    EXPECT_TRUE(world.exists(bundleMarker));
+    world.putContainer(system + firstUuid, metadataOf(12, 499, "com.veltra.settingsd"));
+    world.write(system + "com.veltra.settingsd/something", "x");
+    EXPECT_FALSE(world.services().store().migrator.performWhitelistMigrationWithError().succeeded);
+    EXPECT_TRUE(world.exists(system + firstUuid) && world.exists(system + "com.veltra.settingsd/something"));
 }
 
 // Goal: the old place's owner reaches nothing else by it, nor keeps the migration from ending. Method: a link, to a
@@ -166,7 +156,7 @@ TEST(Migration, BundlesOfAHostileOwner) {
         if (put == Put::file)
             world.write(place, "x");
         else
-            ASSERT_EQ(::symlink(world.path("etc/elsewhere").c_str(), world.path(place).c_str()), 0);
+            world.link(world.path("etc/elsewhere"), place);
         const auto outcome = migrateBundles(world);
         EXPECT_EQ(outcome.succeeded, succeeds);
         EXPECT_EQ(outcome.migrated, besideOthers ? 1U : 0U);
@@ -213,8 +203,7 @@ TEST(Migration, WhatBelongsToOthersStaysTheirs) {
             EXPECT_TRUE(world.exists(bundleMarker));
             EXPECT_EQ(world.item(row.after), directoryOf(owner, 0700));
             EXPECT_EQ(support::readTree(world.path(row.after)).describe(), before);
-            const auto said = world.log.take();
-            EXPECT_TRUE(std::ranges::any_of(said, [](const support::LogLine& line) {
+            EXPECT_TRUE(std::ranges::any_of(world.log.take(), [](const support::LogLine& line) {
                 return line.message.find(" belongs to ") != std::string::npos;
             }));
             EXPECT_TRUE(world.create("com.example.new", ContainerClass::bundleApplication));
@@ -227,34 +216,10 @@ TEST(Migration, AMarkerThatCannotBeExamined) {
     World world;
     world.makeDirectories("elsewhere");
     world.makeDirectories(parentOf(libraryPath));
-    ASSERT_EQ(::symlink(world.path("elsewhere").c_str(), world.path(libraryPath).c_str()), 0);
+    world.link(world.path("elsewhere"), libraryPath);
     putFormerBundle(world, former + "/Application/" + firstUuid, "a");
     EXPECT_EQ(migrateBundles(world).migrated, 0U);
     EXPECT_TRUE(world.exists(former + "/Application/" + firstUuid));
-}
-
-// Goal: well-known containers move to their names, once; a taken name stops it. Method: both classes, twice.
-TEST(Migration, WellknownContainers) {
-    World world;
-    const std::string identifier = "com.veltra.settingsd";
-    const std::string group = std::string(sharedPath) + "/Shared/SystemGroup/";
-    world.putContainer(system + firstUuid, metadataOf(12, 499, identifier));
-    world.putContainer(system + secondUuid, metadataOf(12, 499, "com.example.other"));
-    world.putContainer(group + firstUuid, metadataOf(13, 499, "systemgroup.com.veltra.fonts"));
-    auto& migrator = world.services().store().migrator;
-    EXPECT_EQ(migrator.performWhitelistMigrationWithError().migrated, 2U);
-    EXPECT_TRUE(world.exists(system + secondUuid));
-    EXPECT_TRUE(world.exists(group + "systemgroup.com.veltra.fonts"));
-    const auto found = world.services().cache().containerForUser(499, ContainerClass::dataSystem, &identifier, false);
-    ASSERT_TRUE(found);
-    EXPECT_EQ((*found)->url().path(), world.path(system + identifier));
-    EXPECT_EQ(migrator.performWhitelistMigrationWithError().migrated, 0U);
-
-    World taken;
-    taken.putContainer(system + firstUuid, metadataOf(12, 499, identifier));
-    taken.write(system + identifier + "/something", "x");
-    EXPECT_FALSE(taken.services().store().migrator.performWhitelistMigrationWithError().succeeded);
-    EXPECT_TRUE(taken.exists(system + firstUuid));
 }
 
 /// A container that keeps its group itself, as an older system left it.
@@ -268,12 +233,11 @@ void putWithGroup(const World& world, const std::string& directory, std::uint64_
 
 // Goal: groups kept in containers come into the map, once; an error keeps the marker away. Method: the second fails.
 TEST(Migration, GroupIdentifiers) {
-    World world({.logLevel = logLevelDebug});
+    World world;
     world.write("etc/passwd", "mobile:x:501:501::/private/var/mobile:/bin/sh\n");
     putWithGroup(world, applications, 2, "com.example.a", firstUuid);
     putWithGroup(world, std::string(mobileContainers) + "/Data/KolvexPlugin", 4, "com.example.b", secondUuid);
     world.load();
-    world.log.take();
     const auto migrate = [&] {
         return world.services().store().entitlementPasses.migrateAppGroupIdsFromDataContainersToFile();
     };
@@ -303,54 +267,26 @@ TEST(Migration, GroupIdentifiers) {
 TEST(Migration, GroupsStayUntilTheirIdentifiersAreMigrated) {
     const std::string groups = "private/var/second/Containers/Shared/AppGroup";
     const std::string plugins = std::string(mobileContainers) + "/Data/VPNPlugin";
-    const std::string other = "com.example.b";
-    const auto boot = [](World& world) {
-        world.restart();
-        world.daemonsClient().rebootContainerManagerSetup();
-    };
     World world;
     putWithGroup(world, applications, 2, "a", firstUuid);
     world.putContainer(groups + "/" + firstUuid, metadataOf(7, second, "group.a", firstUuid));
     world.putContainer(groups + "/" + secondUuid, metadataOf(7, second, "unreferenced", secondUuid));
-    ASSERT_EQ(::symlink("/", world.path(plugins).c_str()), 0);
-    boot(world);
-    EXPECT_EQ(world.names(groups).size(), 2U);
+    world.link("/", plugins);
+    world.reboot();
     world.restart();
     const Dictionary entitled{{std::string(entitlementKeys::applicationGroups), Array{"group.a"}}};
-    for (const Dictionary* entitlements : {&entitled, static_cast<const Dictionary*>(nullptr)})
-        ASSERT_EQ(world.services().store().entitlementChange.processEntitlements(entitlements, &other, nullptr),
-                  ErrorCode::success);
+    for (const auto& entitlements : {std::optional(entitled), std::optional<Dictionary>()})
+        ASSERT_EQ(world.entitle("com.example.b", entitlements), ErrorCode::success);
     EXPECT_EQ(world.names(groups).size(), 2U);
-    ASSERT_EQ(::unlink(world.path(plugins).c_str()), 0);
-    boot(world);
+    std::filesystem::remove(world.path(plugins));
+    world.reboot();
     EXPECT_EQ(world.names(groups), std::vector<std::string>{firstUuid});
 
     World without;
     without.write("etc/passwd", "second:x:502:502::/private/var/second:/bin/sh\n");
     without.putContainer(groups + "/" + secondUuid, metadataOf(7, second, "unreferenced", secondUuid));
-    boot(without);
+    without.reboot();
     EXPECT_TRUE(without.names(groups).empty());
-}
-
-// Goal: exactly the unentitled go, none while nothing is known. Method: three, with an unreadable file and without.
-TEST(Migration, UnentitledSystemContainers) {
-    World world({.logLevel = logLevelDebug});
-    world.putContainer(system + firstUuid, metadataOf(12, 499, "entitled", firstUuid));
-    world.putContainer(system + secondUuid, metadataOf(12, 499, "not entitled", secondUuid));
-    world.putContainer(system + thirdUuid, metadataOf(12, 499, "unknown", thirdUuid));
-    world.write(entitlementFile, "broken");
-    world.load();
-    world.log.take();
-    ZOREntitlementMapping& mapping = world.services().entitlements();
-    EXPECT_EQ(world.services().store().entitlementPasses.reconcileSystemContainers(), 0U);
-    EXPECT_EQ(world.complaints("reconcileSystemContainers").size(), 1U);
-    ASSERT_EQ(::unlink(world.path(entitlementFile + ".unreadable").c_str()), 0);
-    const std::string key(entitlementKeys::systemContainer);
-    ASSERT_TRUE(mapping._setEntitlementDictionaryValues({Dictionary{{key, true}}, Dictionary{{key, false}}},
-                                                        {"entitled", "not entitled"}));
-    EXPECT_EQ(world.services().store().entitlementPasses.reconcileSystemContainers(), 2U);
-    EXPECT_EQ(world.names(parentOf(system)), std::vector<std::string>{firstUuid});
-    EXPECT_EQ(world.complaints("reconcileSystemContainers").size(), 2U);
 }
 
 } // namespace

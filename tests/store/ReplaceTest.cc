@@ -5,9 +5,10 @@
 
 #include <algorithm>
 #include <array>
+#include <filesystem>
 #include <gtest/gtest.h>
 #include <map>
-#include <unistd.h>
+#include <tuple>
 
 namespace zor::test {
 namespace {
@@ -16,7 +17,6 @@ using support::DiskCall;
 using support::DiskCallInfo;
 using support::FaultSpan;
 using Preserve = ZORClientConnection::PreserveOldUUID;
-using Request = ZORClientConnection::ReplaceRequest;
 
 constexpr ContainerClass bundle = ContainerClass::bundleApplication;
 // What the journals that a test puts speak of.
@@ -39,12 +39,6 @@ protected:
         world.write(world.relative(made.path) + "/content", transient ? "new" : "old");
         return made;
     }
-    static Request swap(const FoundContainer* old, const FoundContainer& fresh, Preserve preserve = Preserve::no) {
-        return swapOf(old, fresh, preserve);
-    }
-    Result<void> replace(const Request& request) {
-        return world.daemonsClient().replaceContainer(request, StartDeletionThread::no);
-    }
     [[nodiscard]] std::string contentOf(const FoundContainer& container) const {
         return world.read(world.relative(container.path) + "/content");
     }
@@ -52,20 +46,6 @@ protected:
     bool isQuiet() {
         return world.names(staging).empty() && world.names(journals).empty() &&
                world.services().locks().identifiersInUse() == 0;
-    }
-    void relaunch() {
-        world.restart();
-        world.launch();
-    }
-    /// A journal as a launch may find it: old, new, staging and destination, empty ones left out.
-    void putJournal(const std::array<std::string, 4>& paths) const {
-        const std::array<const char*, 4> keys = {"ZORReplaceOperationOldURL", "ZORReplaceOperationNewURL",
-                                                 "ZORReplaceOperationStagingURL", "ZORReplaceOperationDestURL"};
-        plist::Dictionary content;
-        for (std::size_t i = 0; i < keys.size(); ++i)
-            if (!paths[i].empty())
-                content.set(keys[i], paths[i].starts_with('/') ? paths[i] : world.path(paths[i]));
-        world.write(journals + "/" + journal + ".plist", binary(content));
     }
 };
 
@@ -81,17 +61,22 @@ protected:
 // Method: the three kinds of replace, for data and bundles.
 TEST_F(Replace, PutsTheNewOneInPlace) {
     enum class Kind { noOld, old, preserving };
-    for (const ContainerClass containerClass : {application, bundle})
+    for (const ContainerClass containerClass : {application, bundle, ContainerClass::dataSystem})
         for (const Kind kind : {Kind::noOld, Kind::old, Kind::preserving}) {
             SCOPED_TRACE(std::string(className(containerClass)) + " " + std::to_string(static_cast<int>(kind)));
-            const std::string identifier = "com.example." + std::to_string(static_cast<int>(kind));
+            // A well-known one lives under its name, whichever takes its place.
+            const bool wellKnown = containerClass == ContainerClass::dataSystem;
+            if (wellKnown && kind == Kind::noOld)
+                continue;
+            const std::string identifier =
+                wellKnown ? "com.veltra.settingsd" : "com.example." + std::to_string(static_cast<int>(kind));
             std::optional<FoundContainer> old;
             if (kind != Kind::noOld)
                 old = make(identifier, false, containerClass);
             const FoundContainer fresh = make(identifier, asTransient, containerClass);
             const FoundContainer& named = kind == Kind::preserving ? *old : fresh;
-            EXPECT_EQ(complaintOf(replace(
-                          swap(old ? &*old : nullptr, fresh, kind == Kind::preserving ? Preserve::yes : Preserve::no))),
+            EXPECT_EQ(complaintOf(world.replace(old ? &*old : nullptr, fresh,
+                                                kind == Kind::preserving ? Preserve::yes : Preserve::no)),
                       "");
             EXPECT_TRUE(isQuiet());
             for (int launch = 0; launch < 2; ++launch) {
@@ -99,12 +84,11 @@ TEST_F(Replace, PutsTheNewOneInPlace) {
                 ASSERT_TRUE(found) << found.error().text();
                 EXPECT_EQ(contentOf(*found), "new");
                 EXPECT_EQ(found->uuid, named.uuid);
-                EXPECT_EQ(nameOf(found->path), nameOf(named.path));
+                EXPECT_EQ(nameOf(found->path), wellKnown ? identifier : nameOf(named.path));
                 EXPECT_FALSE(isThere(fresh.path));
                 world.restart();
             }
         }
-    EXPECT_EQ(world.deathRow().size(), 8U); // an old container and a journal for each of four
 }
 
 // Goal: each reason against a replace has its code, and nothing moves. Method: requests that a good one differs from.
@@ -115,22 +99,20 @@ TEST_F(Replace, RefusesBeforeAnythingMoves) {
     const FoundContainer freshOther = make("b", asTransient);
     const FoundContainer wellKnown = world.make("com.veltra.settingsd", ContainerClass::dataSystem);
     using enum ErrorCode;
-    const std::pair<Request, ErrorCode> rows[] = {
-        {swap(nullptr, fresh, Preserve::yes), invalidObject},
-        {swap(&old, old), replacedByItself},
-        {swap(nullptr, wellKnown), pathNotAsExpected},
-        {swap(nullptr, old), alreadyExists},
-        {swap(nullptr, fresh), alreadyExists},
+    const std::pair<Result<void>, ErrorCode> rows[] = {
+        {world.replace(nullptr, fresh, Preserve::yes), invalidObject},
+        {world.replace(&old, old), replacedByItself},
+        {world.replace(nullptr, wellKnown), pathNotAsExpected},
+        {world.replace(nullptr, old), alreadyExists},
+        {world.replace(nullptr, fresh), alreadyExists},
         // The new one's identifier has another live container: two of one identifier must not come to be.
-        {swap(&old, freshOther), alreadyExists},
+        {world.replace(&old, freshOther), alreadyExists},
     };
-    for (const auto& [request, code] : rows) {
-        EXPECT_EQ(codeOf(replace(request)), code);
-        EXPECT_TRUE(isQuiet());
-        EXPECT_EQ(contentOf(old), "old");
-        EXPECT_EQ(contentOf(fresh), "new");
-    }
-    EXPECT_TRUE(replace(swap(&old, fresh)));
+    for (const auto& [answer, code] : rows)
+        EXPECT_EQ(codeOf(answer), code) << &code - &rows[0].second;
+    EXPECT_TRUE(isQuiet());
+    EXPECT_EQ(contentOf(old) + contentOf(fresh), "oldnew");
+    EXPECT_TRUE(world.replace(&old, fresh));
 }
 
 // Goal: each state that a stop can leave becomes a whole one. Method: the states put on disk one by one, a launch.
@@ -139,41 +121,38 @@ TEST_F(Replace, EveryStateOfTheTableIsRecovered) {
     const std::string& fresh = newPlace;
     const std::string& dest = destination;
     struct Row {
-        const char* name;
+        const char* said;
         std::vector<std::string> there; // each holds a file that says where it was put
         std::array<std::string, 4> paths;
         std::map<std::string, std::string> after; // place to what it must hold
-        const char* said;
     };
     const std::array<std::string, 4> paths = {old, fresh, waiting, dest};
     const std::array<std::string, 4> preserving = {old, fresh, waiting, old};
     const std::array<std::string, 4> behindLink = {applications + "/loop/x", fresh, waiting, dest};
+    const std::array<std::string, 4> movedRoot = {"/elsewhere/" + old, "/elsewhere/" + old + "x",
+                                                  "/elsewhere/" + waiting, "/elsewhere/" + old};
     const Row rows[] = {
-        {"not yet moved", {old, fresh}, paths, {{old, old}, {fresh, fresh}}, ": nothing had moved"},
-        {"old moved", {waiting, fresh}, paths, {{old, waiting}, {fresh, fresh}}, ": the old one had moved"},
-        {"old moved, preserving", {waiting, fresh}, preserving, {{old, waiting}, {fresh, fresh}}, ": the old one had"},
-        {"both moved", {waiting, dest}, paths, {{dest, dest}}, ": both had moved"},
-        {"both moved, preserving", {waiting, old}, preserving, {{old, old}}, ": both had moved"},
-        {"staging gone", {dest}, paths, {{dest, dest}}, ": nothing was waiting any more"},
-        {"staging gone, preserving", {old}, preserving, {{old, old}}, ": nothing was waiting any more"},
-        {"both moved, old behind a link", {waiting, dest}, behindLink, {{dest, dest}}, ": both had moved"},
-        {"nothing left", {}, paths, {}, ": nothing is left"},
-        {"a path missing", {waiting, fresh}, {old, "", waiting, dest}, {{fresh, fresh}}, "Invalid replace data"},
-        {"a root that was moved as a whole",
-         {waiting},
-         {"/elsewhere/" + old, "/elsewhere/" + old + "x", "/elsewhere/" + waiting, "/elsewhere/" + old},
-         {{old, waiting}},
-         ": the old one had moved"},
+        {": nothing had moved", {old, fresh}, paths, {{old, old}, {fresh, fresh}}},
+        {": the old one had moved", {waiting, fresh}, paths, {{old, waiting}, {fresh, fresh}}},
+        {": the old one had moved", {waiting, fresh}, preserving, {{old, waiting}, {fresh, fresh}}},
+        {": the old one had moved", {waiting}, movedRoot, {{old, waiting}}},
+        {": both had moved", {waiting, dest}, paths, {{dest, dest}}},
+        {": both had moved", {waiting, old}, preserving, {{old, old}}},
+        {": both had moved", {waiting, dest}, behindLink, {{dest, dest}}},
+        {": nothing was waiting any more", {dest}, paths, {{dest, dest}}},
+        {": nothing was waiting any more", {old}, preserving, {{old, old}}},
+        {": nothing is left", {}, paths, {}},
+        {"Invalid replace data", {waiting, fresh}, {old, "", waiting, dest}, {{fresh, fresh}}},
     };
     world.makeDirectories(applications, mobile);
-    ASSERT_EQ(::symlink("elsewhere", world.path(applications + "/loop").c_str()), 0);
+    world.link("elsewhere", applications + "/loop");
     for (const Row& row : rows) {
-        SCOPED_TRACE(row.name);
+        SCOPED_TRACE(&row - rows);
         for (const std::string& place : row.there)
             world.write(place + "/content", place);
-        putJournal(row.paths);
+        world.putJournal(journal, row.paths);
         world.log.take();
-        relaunch();
+        world.relaunch();
         std::map<std::string, std::string> after;
         for (const std::string& place : {old, fresh, dest})
             if (world.exists(place))
@@ -184,7 +163,7 @@ TEST_F(Replace, EveryStateOfTheTableIsRecovered) {
             return line.level <= 5 && line.message.find(row.said) != std::string::npos;
         }));
         for (const std::string& place : {old, fresh, dest})
-            (void)world.daemonsClient()._moveItemAtURLToDeathRow(world.url(place), StartDeletionThread::no);
+            std::filesystem::remove_all(world.path(place));
     }
 }
 
@@ -199,15 +178,13 @@ TEST_F(Replace, ARecoveryThatStopsKeepsWhatItStillNeeds) {
         world.putContainer(waiting, metadataOf(2, mobile, "kept"));
         world.write(waiting + "/content", "old");
         world.write(staging + "/rubbish/content", "half-made");
-        putJournal({oldPlace, oldPlace + "x", waiting, oldPlace});
+        world.putJournal(journal, {oldPlace, oldPlace + "x", waiting, oldPlace});
         world.log.take();
         world.disk().arm({.error = EIO, .span = FaultSpan::fromThenOn, .filter = [&](const DiskCallInfo& call) {
                               return call.call == DiskCall::rename && call.subject.starts_with(journal + " -> ");
                           }});
         world.launch();
         EXPECT_TRUE(world.disk().met());
-        EXPECT_EQ(world.complaints("containerManagerSetup"),
-                  (std::vector<std::string>{"Failed recovering from replace operations"}));
         for (const bool transient : {false, true}) {
             EXPECT_EQ(codeOf(world.create("kept", application, transient)), ErrorCode::journalUnusable);
             EXPECT_EQ(codeOf(world.find("kept", application, transient)), ErrorCode::journalUnusable);
@@ -218,15 +195,15 @@ TEST_F(Replace, ARecoveryThatStopsKeepsWhatItStillNeeds) {
         EXPECT_EQ(world.names(journals), journalFile);
         world.disk().disarm();
         if (byLaunch)
-            relaunch();
+            world.relaunch();
         const auto found = world.create("kept");
         ASSERT_TRUE(found);
         EXPECT_TRUE(found->existed);
         EXPECT_EQ(world.read(oldPlace + "/content"), "old");
         EXPECT_TRUE(isQuiet());
         EXPECT_EQ(world.names(applications).size(), 2U);
-        (void)world.daemonsClient()._moveItemAtURLToDeathRow(world.url(oldPlace), StartDeletionThread::no);
-        relaunch();
+        std::filesystem::remove_all(world.path(oldPlace));
+        world.relaunch();
     }
     // A journal that cannot be read names nothing; while it cannot go either, it stays.
     world.write(journals + "/" + journalFile[0], "rubbish");
@@ -252,7 +229,7 @@ TEST_F(ReplaceWithoutOrder, ASyncThatFailsLosesNothing) {
                 const FoundContainer old = make(identifier, false);
                 const FoundContainer fresh = make(identifier, asTransient);
                 world.disk().arm({.point = point, .span = span, .filter = isSync});
-                const auto replaced = replace(swap(&old, fresh, preserve));
+                const auto replaced = world.replace(&old, fresh, preserve);
                 met = world.disk().met();
                 EXPECT_EQ(replaced.has_value(), !met);
                 const auto live = world.services().cache().containerForUser(mobile, application, &identifier, false);
@@ -272,35 +249,13 @@ TEST_F(ReplaceWithoutOrder, ASyncThatFailsLosesNothing) {
                     ++waited;
                     EXPECT_EQ(deletion(), ErrorCode::success);
                 }
-                relaunch();
+                world.relaunch();
                 EXPECT_FALSE(world.find(identifier));
                 EXPECT_TRUE(isQuiet());
             }
         }
     EXPECT_GT(undone, 2);
     EXPECT_GT(waited, 0);
-}
-
-// Goal: an old one that cannot be moved back is not lost, and nothing is made beside it. Method: the sync behind its
-// move and the move back fail.
-TEST_F(ReplaceWithoutOrder, AnOldOneThatCannotGoBackWaits) {
-    const FoundContainer old = make("waits", false);
-    const FoundContainer fresh = make("waits", asTransient);
-    bool away = false;
-    world.disk().arm({.span = FaultSpan::fromThenOn, .filter = [&](const DiskCallInfo& call) {
-                          away = away || call.subject.starts_with(nameOf(old.path) + " -> ");
-                          return away && (isSync(call) || call.subject.ends_with(" -> " + nameOf(old.path)));
-                      }});
-    EXPECT_EQ(codeOf(replace(swap(&old, fresh))), ErrorCode::journalUnusable);
-    EXPECT_EQ(codeOf(world.create("waits")), ErrorCode::journalUnusable);
-    EXPECT_EQ(codeOf(replace(swap(nullptr, fresh))), ErrorCode::journalUnusable);
-    world.disk().disarm();
-    const auto found = world.create("waits");
-    ASSERT_TRUE(found);
-    EXPECT_EQ(found->uuid, old.uuid);
-    EXPECT_EQ(contentOf(*found), "old");
-    EXPECT_EQ(contentOf(fresh), "new");
-    EXPECT_TRUE(isQuiet());
 }
 
 // Goal: a wipe keeps path and UUID and leaves a new one's content. Method: a table of clients and classes, a restart.
@@ -314,13 +269,7 @@ TEST_F(Replace, WipesToWhatANewOneHolds) {
     const Client nobody{.userId = 0};
     const Client entitled{.userId = 0, .entitledWipeIdentifiers = std::vector<std::string>{identifier}};
     using enum ErrorCode;
-    struct Row {
-        const Client& client;
-        const std::string* identifier;
-        ContainerClass containerClass;
-        ErrorCode code;
-    };
-    const Row rows[] = {
+    const std::tuple<Client, const std::string*, ContainerClass, ErrorCode> rows[] = {
         {all, nullptr, application, identifierMissing},
         {all, &identifier, bundle, invalidObject},
         {all, &identifier, ContainerClass::dataSystem, invalidObject},
@@ -332,17 +281,13 @@ TEST_F(Replace, WipesToWhatANewOneHolds) {
         {entitled, &identifier, plugin, success},
         {all, &identifier, application, success},
     };
-    for (const Row& row : rows)
-        EXPECT_EQ(codeOf(world.client(row.client)
-                             ->deleteDataContainerContentForUser(mobile, row.identifier, row.containerClass)),
-                  row.code)
-            << &row - rows;
+    for (const auto& [client, whose, containerClass, code] : rows)
+        EXPECT_EQ(codeOf(world.client(client)->deleteDataContainerContentForUser(mobile, whose, containerClass)), code);
     world.restart();
     for (const FoundContainer& container : wiped) {
         const auto found = world.find(identifier, container.record->containerClass());
         ASSERT_TRUE(found);
-        EXPECT_EQ(found->path, container.path);
-        EXPECT_EQ(found->uuid, container.uuid);
+        EXPECT_EQ(found->path + found->uuid.string(), container.path + container.uuid.string());
         EXPECT_EQ(world.names(world.relative(found->path)),
                   (std::vector<std::string>{names::metadataFile, "Documents", "Library", "tmp"}));
     }

@@ -1,8 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // What the daemon could not look at, for want of descriptors or because the disk refused: it deletes nothing for that,
 // and keeps no answer that came of it.
-#include "store/ReplaceJournal.h"
-#include "store/ZOREntitlementMapping.h"
 #include "support/FewDescriptors.h"
 #include "world/World.h"
 
@@ -21,22 +19,10 @@ protected:
 
     /// The daemon ended after the first of a replace's two moves.
     void stopAReplaceOf(const FoundContainer& old) {
-        Composition& store = world.services();
-        const UUID uuid = UUID::random();
-        const FileURL oldUrl = FileURL::directory(old.path);
-        const ReplaceJournal journal{.oldUrl = oldUrl,
-                                     .newUrl = oldUrl,
-                                     .stagingUrl =
-                                         store.configuration().stagingDirectory().appendingDirectory(uuid.string()),
-                                     .destUrl = oldUrl};
-        ASSERT_TRUE(
-            journal._writeToDiskReplaceAt(store.log(), store.defaultManager(),
-                                          ReplaceJournal::urlFor(store.configuration().replaceDirectory(), uuid)));
-        ASSERT_TRUE(store.defaultManager().moveItemAtURL(oldUrl, journal.stagingUrl));
-    }
-    void relaunch() {
-        world.restart();
-        world.launch();
+        const std::string name = UUID::random().string();
+        world.makeDirectories(staging);
+        world.putJournal(name, {old.path, old.path, staging + "/" + name, old.path});
+        world.move(old.path, staging + "/" + name);
     }
 
     World world;
@@ -54,7 +40,7 @@ TEST_F(Shortage, JournalsThatCannotBeReadKeepWhatTheyName) {
         SCOPED_TRACE(trouble);
         stopAReplaceOf(old);
         if (trouble == noDirectory) {
-            std::filesystem::rename(there, there + ".aside");
+            world.move(there, there + ".aside");
             world.write(journals, "no directory");
         }
         world.disk().unreadable = [&](int fd) {
@@ -62,18 +48,18 @@ TEST_F(Shortage, JournalsThatCannotBeReadKeepWhatTheyName) {
             const bool fails = trouble != noDirectory && path.starts_with(there);
             return fails && trouble == noMemory ? throw std::bad_alloc() : fails ? trouble : 0;
         };
-        relaunch();
+        world.relaunch();
         EXPECT_EQ(codeOf(world.create("old")),
                   trouble == noMemory ? ErrorCode::exceptionCaught : ErrorCode::journalUnusable);
         EXPECT_TRUE(trouble == noMemory || world.create("another"));
         world.disk().unreadable = nullptr;
         if (trouble == noDirectory) {
             std::filesystem::remove(there);
-            std::filesystem::rename(there + ".aside", there);
+            world.move(there + ".aside", there);
         }
         for (int launch = 0; launch < 2; ++launch) {
             EXPECT_EQ(world.make("old").path, old.path);
-            relaunch();
+            world.relaunch();
         }
     }
 }
@@ -108,9 +94,9 @@ TEST_F(Shortage, EachOperationWithFewDescriptors) {
         before = support::readTree(old.path).describe();
     };
     const auto deleteOld = [&] {
-        const std::string identifier = old.record->identifier();
-        return world.daemonsClient().deleteContainerForUser(old.record->uid(), &identifier,
-                                                            old.record->containerClass(), false);
+        return world.daemonsClient()
+            .deleteContainerForUser(old.record->uid(), &old.record->identifier(), old.record->containerClass(), false)
+            .has_value();
     };
     const auto size = [&] {
         const auto usage = world.daemonsClient().diskUsageForUserId(addressOf(old));
@@ -149,11 +135,11 @@ TEST_F(Shortage, EachOperationWithFewDescriptors) {
              size();
              EXPECT_TRUE(done) << bytes;
          }},
-        {"deletion", [&] { makeOld(); }, [&] { done = deleteOld().has_value(); },
+        {"deletion", [&] { makeOld(); }, [&] { done = deleteOld(); },
          [&] {
              const bool stays = isThere(old.path);
              EXPECT_TRUE(!stays || support::readTree(old.path).describe() == before);
-             EXPECT_EQ(deleteOld().has_value(), stays);
+             EXPECT_EQ(deleteOld(), stays);
          }},
         {"replace",
          [&] {
@@ -170,7 +156,7 @@ TEST_F(Shortage, EachOperationWithFewDescriptors) {
              ASSERT_TRUE(now);
              EXPECT_TRUE(contentOf(*now) == "new" || (!done && contentOf(*now) == "old"));
              ASSERT_TRUE(deleteOld());
-             relaunch();
+             world.relaunch();
              EXPECT_FALSE(world.find(old.record->identifier()));
          }},
         {"launch over a stopped replace",
@@ -185,7 +171,7 @@ TEST_F(Shortage, EachOperationWithFewDescriptors) {
          },
          [&] {
              EXPECT_EQ(world.make("kept").path, kept.path);
-             relaunch();
+             world.relaunch();
          }},
     };
     for (const Operation& operation : operations) {
@@ -210,21 +196,6 @@ TEST_F(Shortage, EachOperationWithFewDescriptors) {
         EXPECT_EQ(contentOf(kept), "kept");
         EXPECT_EQ(world.names(applications).size(), others + 1);
     }
-}
-
-// Goal: what a client was told to have failed is saved when it asks again. Method: a want of memory, then a launch.
-TEST_F(Shortage, AnEntitlementThatWasNotSavedIsSavedWhenAskedAgain) {
-    const std::string identifier = "app";
-    const plist::Dictionary entitlements{{"k", "v"}};
-    world.disk().arm({.filter = [](const support::DiskCallInfo&) -> bool { throw std::bad_alloc(); }});
-    const auto process = [&] {
-        return world.services().store().entitlementChange.processEntitlements(&entitlements, &identifier, nullptr);
-    };
-    EXPECT_EQ(process(), ErrorCode::exceptionCaught);
-    world.disk().disarm();
-    EXPECT_EQ(process(), ErrorCode::success);
-    world.restart();
-    EXPECT_TRUE(world.services().entitlements().entitlementMappingDict().find(identifier));
 }
 
 } // namespace

@@ -1,7 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // What becomes of another's directory that is renamed to a name which the daemon wants: whoever may write the directory
 // above can do that, also where he may not look inside.
-#include "store/ReplaceJournal.h"
 #include "world/World.h"
 
 #include <fcntl.h>
@@ -49,25 +48,16 @@ ErrorCode replacing(World& world) {
 }
 
 ErrorCode booting(World& world) {
-    world.restart();
-    world.boot();
-    world.drainDeathRow();
+    world.reboot();
     return ErrorCode::success;
 }
 
 /// A replace that had stopped after its first move.
 ErrorCode recovering(World& world) {
     const std::string name = UUID::random().string();
+    const std::string old = applications + "/" + UUID::random().string();
     world.makeDirectories(staging + "/" + name);
-    const FileURL old = world.url(applications + "/" + UUID::random().string());
-    const ReplaceJournal journal{.oldUrl = old,
-                                 .newUrl = world.url(transients + "/" + name),
-                                 .stagingUrl = world.url(staging + "/" + name),
-                                 .destUrl = old};
-    world.makeDirectories(journals);
-    ZORFileManager& files = world.services().defaultManager();
-    EXPECT_TRUE(
-        journal._writeToDiskReplaceAt(world.services().log(), files, world.url(journals + "/" + name + ".plist")));
+    world.putJournal(name, {old, transients + "/" + name, staging + "/" + name, old});
     const auto recovered = world.daemonsClient()._recoverFromReplaceOperationsWithError();
     EXPECT_TRUE(world.exists(staging + "/" + name));
     return codeOf(recovered);
@@ -77,8 +67,7 @@ ErrorCode recovering(World& world) {
 ErrorCode exchanging(World& world) {
     const std::string aside = world.path("private/var/mobile/aside");
     const std::string wanted = world.path(applications);
-    const bool exchanged = ::rename(wanted.c_str(), aside.c_str()) == 0;
-    EXPECT_TRUE(exchanged);
+    world.move(wanted, aside);
     bool done = false;
     world.disk().arm({.filter = [&](const support::DiskCallInfo& call) {
         if (call.call == support::DiskCall::rename && call.subject.find(" -> ") == 36 && !done)
@@ -132,8 +121,7 @@ TEST(WantedName, GivesNothingAway) {
         place("APP", world.make("app"));
         place("GROUP", world.make("systemgroup.x", group));
         world.make("app", application, asTransient);
-        const std::string aside = world.path("private/var/mobile/other");
-        ASSERT_EQ(::rename(world.path(wanted).c_str(), aside.c_str()), 0);
+        world.move(wanted, "private/var/mobile/other");
         world.makeDirectories(wanted, row.owner, 0700);
         world.write(wanted + "/sub/secret", "s", 0600);
         world.write(wanted + "/Data/file", "s", 0600);

@@ -7,8 +7,6 @@
 #include <functional>
 #include <gtest/gtest.h>
 #include <limits>
-#include <sys/resource.h>
-#include <sys/wait.h>
 
 namespace zor::test {
 namespace {
@@ -90,14 +88,12 @@ TEST(Packbuff, RefusesWhatItCannotWrite) {
     const std::uint8_t* const cursor = packbuff->item;
     for (const auto& [write, error] : rows) {
         EXPECT_EQ(write(packbuff.get()), error);
-        EXPECT_EQ(toHex(contentOf(*packbuff)), before);
-        EXPECT_EQ(packbuff->item, cursor);
+        EXPECT_TRUE(toHex(contentOf(*packbuff)) == before && packbuff->item == cursor);
     }
     ByteVector memory(64);
     EXPECT_EQ(sb_packbuff_init_with_buffer(memory.data(), 7, false, packbuffDeallocNone), nullptr);
     for (const std::size_t size : {std::size_t{0}, std::size_t{lengthMax} + 1})
         EXPECT_EQ(sb_packbuff_init_with_buffer(memory.data(), size, true, packbuffDeallocNone), nullptr);
-    EXPECT_EQ(sb_packbuff_init_with_buffer(nullptr, 64, true, packbuffDeallocNone), nullptr);
 }
 
 // Goal: a size that was set to anything makes no later write leave the buffer. Method: every size over a buffer that
@@ -150,6 +146,7 @@ std::string readAll(sb_packbuff* packbuff) {
 TEST(Packbuff, ReadsWhatIsThere) {
     const std::string end = "00 00 00 00 00 00 00 00 ";
     const std::string ab = "02 00 04 00 03 00 00 00 61 62 00 00 00 00 00 00 ";
+    const std::string pair = "02 00 03 00 02 00 00 00 6b 00 00 00 00 00 00 00 ";
     const std::pair<std::string, std::string> rows[] = {
         {end, "end"},
         {"01 00 03 00 f5 01 00 00 " + ab + "03 00 05 00 01 00 00 00 07 00 00 00 00 00 00 00 " + end,
@@ -159,52 +156,33 @@ TEST(Packbuff, ReadsWhatIsThere) {
         {"02 00 01 00 00 00 00 00" + end, "1=error 22"},
         {"02 00 01 00 02 00 00 00 61 62 00 00 00 00 00 00" + end, "1=error 22"},
         {"04 00 01 00 02 00 00 00" + end, "1=error 22"},
-        {"ff ff 01 00 02 00 00 00" + end, "1=error 22"},
         {ab, "4=error 34"},
         {"01 00 01 00 01 00 00 00", "1=error 34"},
-        {"02 00 01 00 08 00 00 00" + end, "1=error 34"},
         {"02 00 01 00 09 00 00 00" + end + end, "1=error 34"},
         {"02 00 01 00 ff ff ff ff" + end, "1=error 34"},
-        {"02 00 01 00 f8 ff ff ff" + end, "1=error 34"},
         {"03 00 01 00 f9 ff ff ff" + end, "1=error 34"},
-        {ab + "02 00 04 00 03 00 00", "4='ab' cut"},
         {ab + "00", "4='ab' cut"},
-        {"00", "cut"},
         {"02 00 04 00 03 00 00", "cut"},
     };
     for (const auto& [hex, read] : rows) {
         const ByteVector bytes = fromHex(hex);
         const EdgeOfMemory memory(bytes); // of any alignment
-        const PackbuffPointer reader = readerOf(memory.data(), bytes.size());
-        ASSERT_TRUE(reader);
-        EXPECT_EQ(readAll(reader.get()), read) << hex;
+        EXPECT_EQ(readAll(readerOf(memory.data(), bytes.size()).get()), read) << hex;
         EXPECT_EQ(toHex({memory.data(), bytes.size()}), toHex(bytes)) << "a reader wrote";
     }
-    ByteVector pair = fromHex("02 00 03 00 02 00 00 00 6b 00 00 00 00 00 00 00" + ab + end);
-    const char* key = nullptr;
-    const char* value = nullptr;
-    std::uint16_t valueType = 99;
-    std::uint32_t length = 0;
-    PackbuffPointer reader = readerOf(pair.data(), pair.size());
-    EXPECT_EQ(sb_packbuff_unpack_key_with_string_value(reader.get(), &key, &valueType, &value, &length), 0);
-    EXPECT_EQ(std::string(key) + "/" + std::string(value, length) + "/" + std::to_string(valueType), "k/ab/4");
     // A key without a value: the type is not told, the error is the value's.
-    valueType = 99;
-    reader = readerOf(pair.data() + 16, pair.size() - 16);
-    EXPECT_EQ(sb_packbuff_unpack_key_with_string_value(reader.get(), &key, &valueType, &value, &length),
-              packbuffInvalidArgument);
-    EXPECT_EQ(valueType, 99);
-}
-
-std::string printed(const sb_packbuff* packbuff) {
-    char* text = nullptr;
-    std::size_t size = 0;
-    std::FILE* const stream = ::open_memstream(&text, &size);
-    sb_packbuff_print(packbuff, stream);
-    std::fclose(stream);
-    const std::string copy(text, size);
-    std::free(text);
-    return copy;
+    for (const bool whole : {true, false}) {
+        ByteVector bytes = fromHex((whole ? pair : "") + ab + end);
+        const char* key = nullptr;
+        const char* value = nullptr;
+        std::uint16_t type = 99;
+        std::uint32_t length = 0;
+        const PackbuffPointer reader = readerOf(bytes.data(), bytes.size());
+        EXPECT_EQ(sb_packbuff_unpack_key_with_string_value(reader.get(), &key, &type, &value, &length),
+                  whole ? packbuffSuccess : packbuffInvalidArgument);
+        EXPECT_EQ(type, whole ? 4 : 99);
+        EXPECT_EQ(std::string(key) + (whole ? std::string(value, length) : ""), whole ? "kab" : "ab");
+    }
 }
 
 // Goal: no bytes make a reader or the dump leave the buffer or run for ever. Method: a whole request at the end of the
@@ -212,14 +190,15 @@ std::string printed(const sb_packbuff* packbuff) {
 TEST(Packbuff, StaysInsideDamagedBytes) {
     const ByteVector whole = golden("request.hex");
     const std::span items = std::span(whole).subspan(24);
-    const auto drive = [](std::span<const std::uint8_t> bytes) {
+    const std::unique_ptr<std::FILE, int (*)(std::FILE*)> nowhere(std::fopen("/dev/null", "w"), &std::fclose);
+    const auto drive = [&](std::span<const std::uint8_t> bytes) {
         const EdgeOfMemory memory(bytes);
         const PackbuffPointer reader = readerOf(memory.data(), bytes.size());
         if (!reader)
             return;
-        (void)printed(reader.get());
+        sb_packbuff_print(reader.get(), nowhere.get());
         (void)readAll(reader.get());
-        (void)printed(reader.get());
+        sb_packbuff_print(reader.get(), nowhere.get());
         EXPECT_LE(reader->item, memory.data() + bytes.size());
     };
     for (std::size_t size = 0; size <= items.size(); ++size)
@@ -230,41 +209,6 @@ TEST(Packbuff, StaysInsideDamagedBytes) {
             damaged[at] = static_cast<std::uint8_t>(value);
             drive(damaged);
         }
-}
-
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__) || defined(__has_feature)
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__) || __has_feature(address_sanitizer) ||               \
-    __has_feature(thread_sanitizer)
-#define ZOR_MEMORY_IS_NOT_LIMITED
-#endif
-#endif
-
-// Goal: without memory the error is told, the buffer is gone, and the handle does no harm until it is freed. Method: a
-// process of its own with a limit on its memory.
-TEST(Packbuff, RunsOutOfMemory) {
-#ifdef ZOR_MEMORY_IS_NOT_LIMITED
-    GTEST_SKIP() << "skipped: sanitizers do not run with a limit on memory";
-#endif
-    const pid_t child = ::fork();
-    if (child == 0) {
-        const PackbuffPointer packbuff(sb_packbuff_new(std::uint32_t{1} << 30));
-        const rlimit limit{.rlim_cur = std::uint64_t{3} << 29, .rlim_max = std::uint64_t{3} << 29};
-        bool holds = packbuff && ::setrlimit(RLIMIT_AS, &limit) == 0;
-        const std::string large(std::size_t{1} << 20, 'x');
-        packbuff->bytes_remaining = 0; // full, without touching a gigabyte
-        holds = holds && sb_packbuff_pack_string(packbuff.get(), 1, large.c_str(), 1U << 20) == packbuffOutOfMemory;
-        holds = holds && sb_packbuff_get_bytes(packbuff.get()) == nullptr && sb_packbuff_get_size(packbuff.get()) == 0;
-        holds = holds && sb_packbuff_pack_uint32(packbuff.get(), 1, 1) == packbuffNotSupported;
-        std::uint16_t valueType = 0;
-        holds = holds && sb_packbuff_get_item_value_type(packbuff.get(), &valueType) == 0;
-        int error = 0;
-        (void)sb_packbuff_unpack_uint32(packbuff.get(), &error);
-        holds = holds && error == packbuffOutOfRange && sb_packbuff_new(1U << 31) == nullptr;
-        ::_exit(holds ? 0 : 1);
-    }
-    int status = 0;
-    ASSERT_EQ(::waitpid(child, &status, 0), child);
-    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
 }
 
 } // namespace

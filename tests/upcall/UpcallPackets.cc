@@ -19,9 +19,8 @@ std::uint32_t numberAt(std::span<const std::uint8_t> bytes, std::size_t offset) 
 
 Items& Items::string(std::uint16_t valueType, std::string_view text) {
     const std::string ended(text);
-    EXPECT_EQ(
-        sb_packbuff_pack_string(packbuff_.get(), valueType, ended.c_str(), static_cast<std::uint32_t>(ended.size())),
-        packbuffSuccess);
+    const auto length = static_cast<std::uint32_t>(ended.size());
+    EXPECT_EQ(sb_packbuff_pack_string(packbuff_.get(), valueType, ended.c_str(), length), packbuffSuccess);
     return *this;
 }
 

@@ -6,6 +6,7 @@
 
 #include <algorithm>
 #include <cstdio>
+#include <filesystem>
 #include <future>
 #include <sched.h>
 #include <stdexcept>
@@ -146,6 +147,28 @@ Result<FoundContainer> World::find(const std::string& identifier, ContainerClass
                                                           {.transient = transient});
 }
 
+ErrorCode World::entitle(const std::string& identifier, const std::optional<plist::Dictionary>& entitlements,
+                         const plist::Dictionary& options) {
+    return composition_->store().entitlementChange.processEntitlements(entitlements ? &*entitlements : nullptr,
+                                                                       &identifier, &options);
+}
+
+ErrorCode World::stage(const FoundContainer& container) {
+    const ZORMetadata& record = *container.record;
+    return codeOf(daemonsClient().stageForDeleteContainersWithUsers(
+        ZORClientConnection::DeletionBatch::of(record.uid(), container.uuid, record.identifier(),
+                                               record.containerClass()),
+        UseLocking::yes));
+}
+
+void World::move(const std::string& from, const std::string& to) const {
+    std::filesystem::rename(at(from), at(to));
+}
+
+void World::link(const std::string& target, const std::string& place) const {
+    std::filesystem::create_symlink(target, at(place));
+}
+
 void World::drainDeathRow() {
     std::promise<void> reached;
     deathRowQueue().async([&] { reached.set_value(); });
@@ -174,6 +197,16 @@ void World::putContainer(std::string_view relative, const plist::Dictionary& met
     const uid_t owner = user ? static_cast<uid_t>(user->asUnsigned().value_or(0)) : 0;
     if (owner > 500 && ::geteuid() == 0)
         require(::chown(path(relative).c_str(), owner, owner) == 0, "chown");
+}
+
+void World::putJournal(const std::string& name, const std::array<std::string, 4>& places) const {
+    const std::array<const char*, 4> keys = {"ZORReplaceOperationOldURL", "ZORReplaceOperationNewURL",
+                                             "ZORReplaceOperationStagingURL", "ZORReplaceOperationDestURL"};
+    plist::Dictionary content;
+    for (std::size_t i = 0; i < keys.size(); ++i)
+        if (!places[i].empty())
+            content.set(keys[i], at(places[i]));
+    write(journals + "/" + name + ".plist", binary(content));
 }
 
 void World::refuse(support::DiskCall call, int error, support::FaultSpan span) {

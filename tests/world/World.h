@@ -17,6 +17,7 @@
 #include "support/SettableRoles.h"
 #include "support/TestRoot.h"
 
+#include <array>
 #include <atomic>
 #include <functional>
 #include <memory>
@@ -135,6 +136,14 @@ public:
     /// What a boot does before it serves; a launch without one does the second half.
     void boot();
     void launch();
+    void reboot() {
+        restart();
+        boot();
+    }
+    void relaunch() {
+        restart();
+        launch();
+    }
     /// Waits until everything queued for death row has run.
     void drainDeathRow();
     /// The code of one deletion pass.
@@ -150,7 +159,15 @@ public:
         return create(identifier, containerClass, transient, userId).value();
     }
 
-    // The disk below the root; paths are relative to it.
+    /// What a registration is answered with; without entitlements it ends one.
+    ErrorCode entitle(const std::string& identifier, const std::optional<plist::Dictionary>& entitlements,
+                      const plist::Dictionary& options = {});
+    /// What the deletion of one container is answered with.
+    ErrorCode stage(const FoundContainer& container);
+
+    // The disk below the root; paths are relative to it, or begin with it.
+    void move(const std::string& from, const std::string& to) const;
+    void link(const std::string& target, const std::string& place) const;
     [[nodiscard]] FileURL url(std::string_view relative) const { return FileURL::directory(path(relative)); }
     [[nodiscard]] std::string relative(const std::string& absolute) const { return absolute.substr(path().size() + 1); }
     /// Empty when there is none.
@@ -164,6 +181,9 @@ public:
 
     /// A container as an earlier launch left it: `relative` is its directory, made with its parents.
     void putContainer(std::string_view relative, const plist::Dictionary& metadata) const;
+
+    /// A journal as a launch may find it: old, new, staging and destination; empty ones are left out.
+    void putJournal(const std::string& name, const std::array<std::string, 4>& places) const;
 
     support::RecordingLog log;
     support::SettableBuild internalBuild;
@@ -180,6 +200,9 @@ public:
     platform::XattrProtectionClass& protection() { return *protection_; }
 
 private:
+    [[nodiscard]] std::string at(const std::string& place) const {
+        return place.starts_with('/') ? place : path(place);
+    }
     void start();
     [[nodiscard]] platform::WorkQueue& deathRowQueue();
 
