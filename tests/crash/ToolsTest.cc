@@ -7,10 +7,8 @@
 #include "support/PowerCut.h"
 
 #include <algorithm>
-#include <csignal>
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <sys/resource.h>
 #include <unistd.h>
 
 namespace zor::support {
@@ -132,31 +130,6 @@ TEST(PowerCutModelTest, TellsSoundFromWrong) {
                 EXPECT_GT(report.examined, 0U);
             }
     }
-}
-
-// Goal: the recorder cannot be passed by. Method: a write that the kernel ends in the middle, and changes around it.
-TEST(RecordingDiskTest, FindsWhatItWasNotTold) {
-    const TemporaryDirectory root;
-    const FileDescriptor top = openDirectory(root.path());
-    LinuxDisk linuxDisk;
-    RecordingDisk disk(linuxDisk, root.path());
-    disk.start();
-    const FileDescriptor file(disk.createFile(top.get(), "f", 0600));
-    struct rlimit before = {};
-    ASSERT_EQ(::getrlimit(RLIMIT_FSIZE, &before), 0);
-    const struct rlimit small = {.rlim_cur = 3, .rlim_max = before.rlim_max};
-    const auto handler = std::signal(SIGXFSZ, SIG_IGN);
-    ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &small), 0);
-    EXPECT_EQ(disk.write(file.get(), Bytes{1, 2, 3, 4, 5}), -EFBIG);
-    ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &before), 0);
-    std::signal(SIGXFSZ, handler);
-    EXPECT_EQ(disk.complaint(), "") << "the first three bytes are recorded";
-    makeDirectory(top.get(), "unseen", 0700);
-    EXPECT_NE(disk.complaint(), "");
-    ASSERT_EQ(::unlinkat(top.get(), "unseen", AT_REMOVEDIR), 0);
-    EXPECT_EQ(disk.complaint(), "");
-    ASSERT_EQ(::fchmod(file.get(), 0666), 0);
-    EXPECT_NE(disk.complaint(), "");
 }
 
 } // namespace

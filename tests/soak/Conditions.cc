@@ -33,12 +33,12 @@ zorvane::Client::Lookup lateLookup() {
 
 } // namespace
 
-Conditions::Conditions(Session& session) : session_(session) {
+Conditions::Conditions(Session& session) : session_(session), home_(session.root() + "/private/var/late") {
     const std::string root = session.root();
     std::ofstream(root + "/etc/passwd", std::ios::app) << "late:x:504:504::/private/var/late:/bin/sh\n";
-    files::create_directories(home());
+    files::create_directories(home_);
     if (::geteuid() == 0)
-        (void)!::chown(home().c_str(), lateUser, lateUser);
+        (void)!::chown(home_.c_str(), lateUser, lateUser);
     files::create_directories(root + "/bin");
     for (const bool first : {true, false}) {
         const std::string program = root + "/bin/" + (first ? "one" : "two");
@@ -46,10 +46,6 @@ Conditions::Conditions(Session& session) : session_(session) {
         whole::writeFile(root + "/etc/zorvane/identities.d/" + (first ? "30" : "31") + "-twin.plist",
                          entryOf(program, twinGroup(first)));
     }
-}
-
-std::string Conditions::home() const {
-    return session_.root() + "/private/var/late";
 }
 
 std::optional<zorvane::Client> Conditions::client() const {
@@ -61,8 +57,8 @@ std::optional<zorvane::Client> Conditions::client() const {
 
 bool Conditions::hold() {
     auto asking = client();
-    if (!asking || !container_.empty())
-        return asking.has_value();
+    if (!asking)
+        return false;
     const zorvane::List groups{zorvane::Value{std::string(lateGroup)}};
     const auto registered = asking->processEntitlements(
         {.identifier = lateIdentifier,
@@ -83,37 +79,32 @@ bool Conditions::hold() {
     return true;
 }
 
-void Conditions::leave() {
+void Conditions::bootWithoutAHome(const std::function<void()>& restart) {
+    if (container_.empty() && !hold())
+        return;
     session_.did("device", "home away");
-    files::rename(home(), home() + ".away");
-}
-
-void Conditions::askInVain() {
-    if (auto asking = client(); asking && asking->createOrLookup(lateLookup()))
+    files::rename(home_, home_ + ".away");
+    restart();
+    auto asking = client();
+    if (asking && asking->createOrLookup(lateLookup()))
         session_.found("a container is served in a home that is away");
-    if (files::exists(home()))
+    if (files::exists(home_))
         session_.found("the daemon made the home that was away");
-}
-
-void Conditions::comeBack() {
     std::error_code error;
-    files::rename(home() + ".away", home(), error);
+    files::rename(home_ + ".away", home_, error);
     if (error)
         session_.found("the home cannot come back: " + error.message());
-}
-
-void Conditions::look(const std::string& when) {
-    auto asking = client();
+    asking = client();
     if (!asking)
         return;
     const auto there = asking->createOrLookup(lateLookup());
     const auto paths = asking->groupContainerPaths(lateUser, lateIdentifier);
     if (!there || there->path != container_ || whole::readFile(container_ + "/" + keptName) != "container")
-        session_.found("the container of the late home " + when + ": " + (there ? there->path : there.error().message) +
-                       ", was " + container_);
+        session_.found("the container of the late home: " + (there ? there->path : there.error().message) + ", was " +
+                       container_);
     if (!paths || !paths->contains(lateGroup) || paths->at(lateGroup) != group_ ||
         whole::readFile(group_ + "/" + keptName) != "group")
-        session_.found("the group of the late home " + when + " is not what it was");
+        session_.found("the group of the late home is not what it was");
 }
 
 void Conditions::oneOfTwoSpeaks(bool first) {

@@ -5,6 +5,8 @@
 
 #include "soak/Session.h"
 
+#include <functional>
+
 namespace zor::soak {
 
 inline constexpr std::uint32_t lateUser = 504;
@@ -14,30 +16,17 @@ public:
     /// Before the daemon starts: the user, the home, the programs and their entries.
     explicit Conditions(Session& session);
     /// `restart` ends the daemon and boots it again.
-    template <typename Restart>
-    void bootWithoutAHome(const Restart& restart) {
-        if (!hold())
-            return;
-        leave();
-        restart();
-        askInVain();
-        comeBack();
-        look("after the home came back");
-    }
+    void bootWithoutAHome(const std::function<void()>& restart);
     /// One of the two programs speaks; the groups of both must be there.
     void oneOfTwoSpeaks(bool first);
 
 private:
-    /// Makes what must not be lost, where it is missing. False: no daemon answered.
+    /// Makes what must not be lost. False: no daemon answered.
     bool hold();
-    void leave();
-    void askInVain();
-    void comeBack();
-    void look(const std::string& when);
-    [[nodiscard]] std::string home() const;
     [[nodiscard]] std::optional<zorvane::Client> client() const;
 
     Session& session_;
+    const std::string home_;
     std::string container_;
     std::string group_;
 };

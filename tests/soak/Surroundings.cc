@@ -41,7 +41,7 @@ void Surroundings::happen(unsigned pauseMillisecondsMax) {
     else if (lot < 75)
         conditions_.oneOfTwoSpeaks(choices_.oneIn(2));
     else if (lot < 78)
-        bootWithoutAHome();
+        conditions_.bootWithoutAHome([&] { boot(); });
     else if (lot < 82)
         hang();
     else if (lot < 90)
@@ -78,10 +78,6 @@ void Surroundings::boot() {
     ++boots_;
     session_.daemon().start({"--forget-boot"});
     check();
-}
-
-void Surroundings::bootWithoutAHome() {
-    conditions_.bootWithoutAHome([&] { boot(); });
 }
 
 void Surroundings::lock(bool locked) {

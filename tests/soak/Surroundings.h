@@ -32,7 +32,6 @@ private:
     void end();
     void kill();
     void boot();
-    void bootWithoutAHome();
     void lock(bool locked);
     void fillDisk();
     void starve();

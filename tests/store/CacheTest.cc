@@ -75,7 +75,7 @@ TEST_F(Cache, AContainerWithoutItsFileIsInconsistent) {
     for (const bool linked : {false, true}) {
         if (linked)
             world.link(world.path("aside"), file);
-        EXPECT_EQ(codeOf(find("a")), ErrorCode::cachedContainerWithoutMetadata);
+        EXPECT_EQ(codeOf(world.find("a")), ErrorCode::cachedContainerWithoutMetadata);
         EXPECT_EQ(codeOf(world.create("a")), ErrorCode::cachedContainerWithoutMetadata);
         EXPECT_EQ(all().size(), 1U);
         EXPECT_EQ(cache().counts().records, 2U);
@@ -111,11 +111,12 @@ TEST_F(Cache, AClassDirectorySwappedForALink) {
     for (const bool built : {false, true}) {
         world.move(applications, "aside");
         world.link(world.path(bait), applications);
-        EXPECT_EQ(codeOf(find("a")), built ? ErrorCode::cachedContainerWithoutMetadata : ErrorCode::cacheNotRebuilt);
-        EXPECT_EQ(codeOf(find("bait")), built ? ErrorCode::notFound : ErrorCode::cacheNotRebuilt);
+        EXPECT_EQ(codeOf(world.find("a")),
+                  built ? ErrorCode::cachedContainerWithoutMetadata : ErrorCode::cacheNotRebuilt);
+        EXPECT_EQ(codeOf(world.find("bait")), built ? ErrorCode::notFound : ErrorCode::cacheNotRebuilt);
         std::filesystem::remove(world.path(applications));
         world.move("aside", applications);
-        EXPECT_TRUE(find("a"));
+        EXPECT_TRUE(world.find("a"));
     }
 }
 

@@ -1,7 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // Creating, finding and listing containers: what a container of each class looks like on disk, transient ones, many
 // clients at once, and what users may leave behind.
-#include "operations/UndisturbedLookup.h"
 #include "support/StoreJudge.h"
 #include "world/World.h"
 
@@ -12,7 +11,6 @@
 #include <future>
 #include <gtest/gtest.h>
 #include <set>
-#include <unistd.h>
 #include <utility>
 
 namespace zor::test {
@@ -143,49 +141,6 @@ TEST_F(Create, LookupsBesideEveryWriter) {
     EXPECT_EQ(wrong, 0);
     for (const auto& own : answers)
         EXPECT_TRUE(std::ranges::includes(noted, own));
-}
-
-// Goal: what is out of the ordinary is left to the lookup under the lock. Method: a table of disturbances.
-TEST_F(Create, LookupsWithoutTheLockGiveWay) {
-    struct Row {
-        const char* what;
-        std::function<void(const FoundContainer&)> disturb;
-        bool givesWay;
-    };
-    const auto metadata = [](const FoundContainer& found) { return found.path + "/" + names::metadataFile; };
-    const Row rows[] = {
-        {"nothing", [](const auto&) {}, false},
-        {"the file's mode has changed", [&](const auto& found) { ::chmod(metadata(found).c_str(), 0600); }, false},
-        {"the file is gone", [&](const auto& found) { ::unlink(metadata(found).c_str()); }, true},
-        {"a link in the file's place",
-         [&](const auto& found) {
-             world.move(metadata(found), found.path + "/other");
-             world.link("other", metadata(found));
-         },
-         true},
-        {"a link on the way",
-         [&](const auto& found) {
-             world.move(found.path, found.path + ".other");
-             world.link(found.path + ".other", found.path);
-         },
-         true},
-        {"its place is not on the disk for good", [](const auto& found) { found.record->setDurable(false); }, true},
-        {"the classes have not been read", [&](const auto&) { world.services().cache().dropAll(); }, true},
-        {"the home is another one",
-         [&](const auto&) {
-             world.move("private/var/mobile", "private/var/mobile.old");
-             world.makeDirectories("private/var/mobile", mobile);
-             (void)world.services().configuration().homeOf(mobile)->look();
-         },
-         true},
-    };
-    for (const Row& row : rows) {
-        SCOPED_TRACE(row.what);
-        const std::string id = "id" + std::to_string(&row - rows);
-        row.disturb(world.make(id));
-        Composition& services = world.services();
-        EXPECT_EQ(!lookUpUndisturbed(services.locks(), services.cache(), mobile, application, id), row.givesWay);
-    }
 }
 
 // Goal: nobody waits for the disk that another's creation waits for, and of two that make the same one the later

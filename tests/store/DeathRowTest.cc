@@ -29,20 +29,6 @@ protected:
     }
 };
 
-TEST_F(DeathRow, EqualNamesDoNotCollideAndMissingItemsAreNoFailure) {
-    world.makeDirectories("a/X");
-    world.makeDirectories("b/X");
-    world.write("c/X", "a file");
-    for (const char* item : {"a/X", "b/X", "c/X", "d/X", "a/X"})
-        ASSERT_TRUE(condemn(item));
-    EXPECT_EQ(world.deathRow(), (Names{"X", "X", "X"}));
-    EXPECT_EQ(world.names(dead).size(), 5U); // two of them empty
-    EXPECT_TRUE(world.complaints("_moveItemAtURLToDeathRow").empty());
-    for (int i = 0; i < 2; ++i)
-        EXPECT_EQ(world.pass(), ErrorCode::success);
-    EXPECT_TRUE(world.names(dead).empty());
-}
-
 // Goal: a pass that takes the fresh unique directory for rubbish costs no item. Method: it goes before the move.
 TEST_F(DeathRow, APassRacesAMove) {
     for (const bool always : {false, true}) {

@@ -62,6 +62,16 @@ TEST_F(Deletion, AMixedBatch) {
     EXPECT_TRUE(world.make("kept").existed && !world.make("first").existed);
 }
 
+// Goal: what waits on death row is in nobody's way. Method: containers of one well-known name, deleted in a row.
+TEST_F(Deletion, EqualNamesDoNotCollide) {
+    for (std::size_t deleted = 1; deleted < 4; ++deleted) {
+        EXPECT_EQ(world.stage(world.make("com.veltra.settingsd", ContainerClass::dataSystem)), ErrorCode::success);
+        EXPECT_EQ(world.names(dead).size(), deleted);
+    }
+    EXPECT_EQ(world.pass(), ErrorCode::success);
+    EXPECT_TRUE(world.names(dead).empty());
+}
+
 // Goal: mappings go with per-user classes, entitlements and children with bundles, and nothing with a transient one.
 // Method: every class with both; first its transient container, then its live one.
 TEST_F(Deletion, WhatGoesWithEachClass) {

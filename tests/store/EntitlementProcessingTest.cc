@@ -255,28 +255,6 @@ TEST_F(Processing, ASaveHoldsOnlyItsOwnChange) {
         EXPECT_TRUE(mapping().entitlementsExistForIdentifier(saved));
 }
 
-// Goal: a boot removes exactly the groups that nobody lists. Method: containers of each kind, then a boot.
-TEST_F(Processing, ABootRemovesGroupsWithoutReferences) {
-    ASSERT_EQ(process(Dictionary{{apps, Array{"g", "g"}}, {groupContainers, Array{"systemgroup.s", "bare"}}}, "a"),
-              ErrorCode::success);
-    std::vector<std::string> kept;
-    std::vector<std::string> gone;
-    for (const std::uint32_t user : {mobile, second}) {
-        kept.push_back(make(user, "g", ContainerClass::sharedAppGroup));
-        kept.push_back(make(user, "h", ContainerClass::dataApplication));
-        gone.push_back(make(user, "h", ContainerClass::sharedAppGroup));
-        gone.push_back(make(user, "systemgroup.s", ContainerClass::sharedAppGroup));
-    }
-    kept.push_back(make(499, "systemgroup.s", ContainerClass::sharedSystemGroup));
-    kept.push_back(make(499, "bare", ContainerClass::sharedSystemGroup));
-    gone.push_back(make(499, "g", ContainerClass::sharedSystemGroup));
-    world.reboot();
-    for (const std::string& path : kept)
-        EXPECT_TRUE(isThere(path)) << path;
-    for (const std::string& path : gone)
-        EXPECT_FALSE(isThere(path)) << path;
-}
-
 // Goal: while an unreadable file lies aside no group and no system container goes. Method: two boots over it, releases
 // between, one without.
 TEST_F(Processing, ALostFileStopsDeletions) {

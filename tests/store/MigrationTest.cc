@@ -231,36 +231,6 @@ void putWithGroup(const World& world, const std::string& directory, std::uint64_
     world.putContainer(directory + "/" + uuid, metadata);
 }
 
-// Goal: groups kept in containers come into the map, once; an error keeps the marker away. Method: the second fails.
-TEST(Migration, GroupIdentifiers) {
-    World world;
-    world.write("etc/passwd", "mobile:x:501:501::/private/var/mobile:/bin/sh\n");
-    putWithGroup(world, applications, 2, "com.example.a", firstUuid);
-    putWithGroup(world, std::string(mobileContainers) + "/Data/KolvexPlugin", 4, "com.example.b", secondUuid);
-    world.load();
-    const auto migrate = [&] {
-        return world.services().store().entitlementPasses.migrateAppGroupIdsFromDataContainersToFile();
-    };
-    // The second file of a container; the map's own files come between.
-    world.disk().arm({.point = 2, .error = ENOSPC, .span = FaultSpan::fromThenOn, .filter = [&](const auto& call) {
-                          return call.call == DiskCall::createFile &&
-                                 call.subject.find("metadata") != std::string::npos;
-                      }});
-    EXPECT_EQ(migrate(), 1U);
-    world.disk().disarm();
-    EXPECT_FALSE(world.exists(groupMarker));
-    world.restart();
-    world.load();
-    EXPECT_EQ(migrate(), 1U);
-    EXPECT_TRUE(world.exists(groupMarker));
-    for (const std::string identifier : {"com.example.a", "com.example.b"})
-        EXPECT_EQ(world.services().entitlements().appGroupIdentifiersForIdentifier(identifier),
-                  ZOREntitlementMapping::Identifiers({"group." + identifier}));
-    EXPECT_EQ(*world.readDictionary(metadataIn(applications + "/" + firstUuid)).dictionary("ZORMetadataInfo"),
-              (Dictionary{{"kept", true}}));
-    EXPECT_EQ(migrate(), 0U);
-}
-
 // Goal: until the migration has ended no application group goes because the map does not mention it; then each goes
 // that nobody refers to, also where the migration's user does not exist. Method: a link in the place of one list, a
 // boot, a release after a restart; a boot without the link; a device without the user.

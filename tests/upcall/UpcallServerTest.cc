@@ -125,8 +125,7 @@ TEST(UpcallServer, AnswersTheKernelAlone) {
     EXPECT_EQ(replyIn(receivePacket(socket.get())).returnCode, 0);
 
     World world;
-    const NoPort port;
-    UpcallServer server(world.services().upcallNeeds(), port);
+    UpcallServer server(world.services().upcallNeeds(), world.linux().roles().upcallPort);
     EXPECT_EQ(replyIn(server.answer({.bytes = good, .senderPid = {}, .senderUserId = {}})).returnCode, -309);
     const ByteVector another = with(good, 12, 0);
     EXPECT_EQ(replyIn(server.answer({.bytes = another, .senderPid = {}, .senderUserId = {}})).returnCode, -300);
@@ -225,25 +224,6 @@ TEST(UpcallServer, TellsAllOrNothing) {
     EXPECT_TRUE(world.disk().met());
     world.disk().disarm();
     EXPECT_EQ(upcall.ask(groups).types(), "100 3 4 3 4 0");
-}
-
-// Goal: a reply that the port cannot send is an empty buffer, one that it just can is whole; whatever is thrown is
-// answered. Method: a port of a size of the test's, around the size of one reply.
-TEST(UpcallServer, AnswersWhatCannotBeSent) {
-    World world;
-    NoPort port;
-    UpcallServer server(world.services().upcallNeeds(), port);
-    const ByteVector packet = Items().string(0, "com.example").number(3, mobile).packet();
-    const platform::UpcallPacket sent{.bytes = packet, .senderPid = 0, .senderUserId = 0};
-    const ByteVector whole = server.answer(sent);
-    EXPECT_EQ(replyIn(whole).types(), "100 1 2 0");
-    port.bytesMax = whole.size();
-    EXPECT_EQ(toHex(server.answer(sent)), toHex(whole));
-    port.bytesMax = whole.size() - 1;
-    EXPECT_EQ(replyIn(server.answer(sent)).returnCode, 0);
-    EXPECT_EQ(replyIn(server.answer(sent)).bufferBytes, 0U);
-    port.fails = true;
-    EXPECT_EQ(replyIn(server.answer(sent)).returnCode, 9);
 }
 
 // Goal: the largest replies come whole through the real port, and one that is too large for it as an empty buffer,

@@ -21,13 +21,14 @@ double secondsOf(const std::function<void()>& work) {
     return std::chrono::duration<double>(std::chrono::steady_clock::now() - begin).count();
 }
 
-/// Whether the daemon answers `ask` at all, be it with an error of its own.
-template <typename Ask>
-bool isAnswered(const DaemonProcess& daemon, Ask ask) {
+using Asks = std::function<bool(zorvane::Client&)>;
+
+/// Whether the daemon answers at all, be it with an error of its own.
+bool isAnswered(const DaemonProcess& daemon, const Asks& ask) {
     auto client = zorvane::Client::connect({.root = daemon.root(), .timeoutMilliseconds = 8'000});
-    if (!client)
-        return false;
-    const auto answer = ask(*client);
+    return client && ask(*client);
+}
+bool come(const auto& answer) {
     return answer || answer.error().kind == zorvane::Error::Kind::daemon;
 }
 
@@ -40,21 +41,25 @@ bool serves(const DaemonProcess& daemon, uid_t user) {
 
 /// Each kind of request about the container, all answered.
 void expectAnswers(const DaemonProcess& daemon, const zorvane::Client::Address& app) {
-    EXPECT_TRUE(isAnswered(daemon, [&](auto& client) { return client.createOrLookup(dataContainer("app")); }));
-    EXPECT_TRUE(isAnswered(daemon, [&](auto& client) { return client.createOrLookup(dataContainer("new")); }));
-    EXPECT_TRUE(isAnswered(daemon, [&](auto& client) { return client.createOrLookup(dataContainer("t", true)); }));
-    EXPECT_TRUE(isAnswered(daemon, [](auto& client) { return client.list(dataApplication, mobile, false); }));
-    EXPECT_TRUE(isAnswered(daemon, [&](auto& client) { return client.diskUsage(app); }));
-    EXPECT_TRUE(isAnswered(daemon, [&](auto& client) { return client.recreateDefaultStructure(app); }));
-    EXPECT_TRUE(isAnswered(daemon, [&](auto& client) { return client.setInfoValue(app, "k", zorvane::Value{true}); }));
-    EXPECT_TRUE(isAnswered(daemon, [](auto& client) {
-        return client.setDataProtection(
-            {.containerClass = dataApplication, .user = mobile, .identifier = "app", .protectionClass = 1});
-    }));
-    EXPECT_TRUE(isAnswered(daemon, [](auto& client) { return client.processEntitlements({.identifier = "app"}); }));
-    EXPECT_TRUE(isAnswered(daemon, [](auto& client) { return client.wipe(dataApplication, mobile, "app"); }));
-    EXPECT_TRUE(isAnswered(daemon, [&](auto& client) { return client.stageForDelete({app}); }));
-    EXPECT_TRUE(isAnswered(daemon, [](auto& client) { return client.emptyDeathRow(); }));
+    using C = zorvane::Client&;
+    const zorvane::Client::ProtectionChange protection{
+        .containerClass = dataApplication, .user = mobile, .identifier = "app", .protectionClass = 1};
+    const Asks requests[] = {
+        [](C client) { return come(client.createOrLookup(dataContainer("app"))); },
+        [](C client) { return come(client.createOrLookup(dataContainer("new"))); },
+        [](C client) { return come(client.createOrLookup(dataContainer("t", true))); },
+        [](C client) { return come(client.list(dataApplication, mobile, false)); },
+        [&](C client) { return come(client.diskUsage(app)); },
+        [&](C client) { return come(client.recreateDefaultStructure(app)); },
+        [&](C client) { return come(client.setInfoValue(app, "k", zorvane::Value{true})); },
+        [&](C client) { return come(client.setDataProtection(protection)); },
+        [](C client) { return come(client.processEntitlements({.identifier = "app"})); },
+        [](C client) { return come(client.wipe(dataApplication, mobile, "app")); },
+        [&](C client) { return come(client.stageForDelete({app})); },
+        [](C client) { return come(client.emptyDeathRow()); },
+    };
+    for (const Asks& request : requests)
+        EXPECT_TRUE(isAnswered(daemon, request)) << &request - requests;
 }
 
 } // namespace
@@ -106,7 +111,8 @@ TEST(UserMount, KeepsNobodyWaiting) {
         for (const bool boot : {true, false}) {
             daemon.start(boot ? std::vector<std::string>{"--forget-boot"} : std::vector<std::string>());
             EXPECT_TRUE(serves(daemon, second));
-            EXPECT_TRUE(isAnswered(daemon, [](auto& client) { return client.createOrLookup(dataContainer("other")); }));
+            EXPECT_TRUE(
+                isAnswered(daemon, [](auto& client) { return come(client.createOrLookup(dataContainer("other"))); }));
             EXPECT_LT(secondsOf([&] { EXPECT_EQ(daemon.terminate(), 0); }), patienceSeconds);
         }
         EXPECT_LT(secondsOf([&] { (void)daemon.tool({"check"}); }), patienceSeconds);

@@ -5,6 +5,7 @@
 #include "os/SystemRoot.h"
 #include "process/DaemonProcess.h"
 #include "support/FileTree.h"
+#include "whole/Expect.h"
 
 #include <algorithm>
 #include <csignal>
@@ -47,8 +48,7 @@ TEST(Users, OneLineSaysWhyTheDaemonDoesNotStart) {
         else
             std::filesystem::remove_all(place.path("private/var/brevad"));
         const auto outcome = runProgram({programPath("zorvaned"), "--root", place.root()});
-        EXPECT_EQ(outcome.exitStatus, 1) << row.said;
-        EXPECT_NE(outcome.output.find(row.said), std::string::npos) << outcome.output;
+        expectOutcome(outcome, 1, row.said);
         EXPECT_EQ(std::ranges::count(outcome.output, '\n'), 1) << outcome.output;
         EXPECT_NE(place.tool({"check"}).exitStatus, 0) << row.said;
     }

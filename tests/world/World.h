@@ -73,15 +73,13 @@ class FailingSandbox final : public platform::SandboxUserState {
 public:
     int setMapping(std::uint32_t userId, platform::SandboxItemType type, std::string_view identifier,
                    const std::optional<std::string>& path) override {
-        const int failure = path ? setError : removeError;
-        return failure != 0 ? failure : inner->setMapping(userId, type, identifier, path);
+        return !path && removeError != 0 ? removeError : inner->setMapping(userId, type, identifier, path);
     }
     unsigned removeDanglingMappings(const std::function<bool(std::uint32_t)>& mayConclude,
                                     const std::function<bool(const std::string&)>& isGone) override {
         return inner->removeDanglingMappings(mayConclude, isGone);
     }
     platform::SandboxUserState* inner = nullptr;
-    int setError = 0;
     int removeError = 0;
 };
 
