@@ -1,56 +1,14 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "base/BlockingScope.h"
 #include "service/ListenerCharges.h"
 #include "service/ListenerPool.h"
 #include "service/ListenerWorld.h"
 #include "support/Allocations.h"
-#include "support/FewDescriptors.h"
 
-#include <algorithm>
 #include <functional>
 #include <future>
-#include <optional>
-#include <sys/socket.h>
 
 namespace zor::platform {
 namespace {
-
-// The listener holds 4,096 connections, each with half a request that is served afterwards, refuses the next at once,
-// and has room again when one goes.
-TEST(ListenerLimits, FourThousandNinetySixConnections) {
-    const support::DescriptorLimit descriptors;
-    if (!descriptors.set(8'400))
-        GTEST_SKIP() << "needs 8,400 descriptors, the hard limit is " << descriptors.hard();
-    ListenerWorld world;
-    ASSERT_EQ(world.limits.connectionsMax, 4096U);
-    world.start();
-    const plist::Data frame = frameOf(numbered(5), 5);
-    std::vector<RawClient> clients = world.connect(4096);
-    for (RawClient& client : clients)
-        ASSERT_TRUE(client.send(partOf(frame, 0, 20)));
-    ASSERT_TRUE(eventually([&] { return world.counters().inputBytes >= 4096 * 20; }));
-    EXPECT_TRUE(world.connect().ended());
-    clients.pop_back();
-    ASSERT_TRUE(eventually([&] { return world.counters().connections == 4095; }));
-    EXPECT_TRUE(world.connect().isServed());
-    for (RawClient& client : clients)
-        ASSERT_TRUE(client.send(partOf(frame, 20, frame.size())) && client.receive());
-}
-
-// A reply that no bytes can hold and a peer that nobody knows are refused, and the next client is served.
-TEST(ListenerLimits, WhatCannotBeAnsweredEnds) {
-    ListenerWorld world;
-    world.start([](PeerConnection&, ServiceEvent& event) { event.reply->send({{"text", "\xff"}}); });
-    for (const bool known : {true, false, true}) {
-        world.identity.knowsPeers = known;
-        RawClient client = world.connect();
-        EXPECT_TRUE(!known || client.send(numbered(1), 1));
-        EXPECT_TRUE(client.ended());
-    }
-    EXPECT_TRUE(world.reports("A reply could not be written: uid " + std::to_string(::geteuid())));
-    EXPECT_TRUE(world.reports("Connection refused, the kernel does not tell the peer: errno "));
-    EXPECT_TRUE(world.isAtRest());
-}
 
 // Shares by user hold and balance: the charges alone, with users that no test can be.
 TEST(ListenerLimits, SharesByUser) {
@@ -107,10 +65,11 @@ TEST(ListenerLimits, SharesByUser) {
     EXPECT_EQ(charges.totals().connections, 0U);
 }
 
-// In the running listener: what is over a user's share is refused or dropped; the others go on.
+// In the running listener: what is over a user's share, and whom the kernel does not tell, is refused or dropped; the
+// others go on.
 TEST(ListenerLimits, AUserOverItsShareIsRefused) {
     ListenerWorld world;
-    world.identity.everybodyOwnsRoot = false;
+    world.identity.owner = static_cast<uid_t>(-1);
     world.limits.connectionsMaxPerUser = 3;
     world.limits.inputBytesMaxPerUser = 300'000;
     world.start();
@@ -122,8 +81,11 @@ TEST(ListenerLimits, AUserOverItsShareIsRefused) {
     ASSERT_TRUE(eventually([&] { return world.counters().inputBytes >= 190'000; }));
     clients[1].send(frameOf(200'000, 1, 1, plist::Data(190'000, 'x')));
     EXPECT_TRUE(clients[1].ended());
-    EXPECT_TRUE(clients[2].isServed());
     EXPECT_EQ(world.counters().connectionsDropped, 1U);
+    world.identity.knowsPeers = false;
+    EXPECT_TRUE(world.connect().ended());
+    EXPECT_TRUE(world.reports("Connection refused, the kernel does not tell the peer: errno "));
+    EXPECT_TRUE(clients[2].isServed());
 }
 
 // A peer that never reads large replies makes the daemon neither work nor hold much, others are served, and when it
@@ -225,48 +187,50 @@ TEST(ListenerLimits, OutOfDescriptorsItNeitherSpinsNorDies) {
 
 using support::NothingLarge;
 
-// Goal: where memory runs out for a request or its reply, one connection ends, charges balance, and others are served.
-// Method: a handler that throws, a request and a reply that are too large, and replies that pile up unread.
+// Goal: where memory runs out for a request or its reply, or a reply cannot be written, one connection ends, charges
+// balance, and others are served. Method: a handler that throws, a request and replies that are too large or no text,
+// and replies that pile up unread.
 TEST(WantOfMemory, EndsOneConnection) {
     if (!support::allocationsCanFail())
         GTEST_SKIP() << "the sanitizer's allocations do not fail";
     constexpr std::size_t large = 100'000;
     ListenerWorld world;
     world.start([](PeerConnection&, ServiceEvent& event) {
-        const std::uint64_t asked = event.request.unsignedInteger("Bytes").value_or(0);
-        if (event.request.isTrue("Throw"))
+        const std::uint64_t asked = event.request.unsignedInteger("Number").value_or(0);
+        if (asked == 1)
             throw std::bad_alloc();
+        if (asked == 2)
+            return event.reply->send({{"text", "\xff"}});
         if (asked == 0)
             return event.reply->send(event.request);
         const plist::Dictionary reply{{"Data", plist::Data(asked)}};
         const NothingLarge limit(large);
         event.reply->send(reply);
     });
-    const auto throws = [](RawClient& client) { return client.send({{"Throw", true}}, 1); };
-    const auto replies = [](RawClient& client) { return client.send({{"Bytes", std::uint64_t{3 * large}}}, 1); };
-    const auto pilesUp = [](RawClient& client) {
-        for (std::uint64_t i = 0; i < 100 && client.send({{"Bytes", std::uint64_t{large / 2}}}, i); ++i)
-            ;
-        ::usleep(100'000);
-        while (client.receive()) {
-        }
-        return true;
-    };
-    const auto requests = [](RawClient& client) {
-        plist::Data half = frameOf(3 * large, ipc::frameExpectsReply, 1, plist::Data(2 * large));
-        const NothingLarge limit(large);
-        return client.send(half) && client.ended();
-    };
-    RawClient bystander(world.socketPath());
-    for (const std::function<bool(RawClient&)>& act :
-         {std::function<bool(RawClient&)>(throws), std::function<bool(RawClient&)>(replies),
-          std::function<bool(RawClient&)>(pilesUp), std::function<bool(RawClient&)>(requests)}) {
-        RawClient client(world.socketPath());
-        EXPECT_TRUE(act(client));
+    const auto asks = [](std::uint64_t number) { return [=](RawClient& client) { client.send(numbered(number), 1); }; };
+    const std::function<void(RawClient&)> acts[] = {
+        asks(1), asks(2), asks(3 * large),
+        [](RawClient& client) {
+            for (std::uint64_t i = 0; i < 100 && client.send(numbered(large / 2), i); ++i)
+                ;
+            ::usleep(100'000);
+            while (client.receive()) {
+            }
+        },
+        [](RawClient& client) {
+            const plist::Data half = frameOf(3 * large, ipc::frameExpectsReply, 1, plist::Data(2 * large));
+            const NothingLarge limit(large);
+            EXPECT_TRUE(client.send(half) && client.ended());
+        }};
+    RawClient bystander = world.connect();
+    for (const auto& act : acts) {
+        RawClient client = world.connect();
+        act(client);
         EXPECT_TRUE(client.ended());
         EXPECT_TRUE(bystander.isServed());
     }
-    EXPECT_EQ(world.counters().connectionsDropped, 4U);
+    EXPECT_EQ(world.counters().connectionsDropped, std::size(acts));
+    EXPECT_TRUE(world.reports("A reply could not be written: uid " + std::to_string(::geteuid())));
     bystander.close();
     EXPECT_TRUE(world.isAtRest());
 }

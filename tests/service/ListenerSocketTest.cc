@@ -1,15 +1,21 @@
 // SPDX-License-Identifier: Apache-2.0
+// The sockets on which peers are met: made, passed on by the service manager, and the status's. And the descriptors
+// that peers pass along with their bytes: they hold no thread, neither one that receives them, nor one that closes the
+// socket in which they lie unread. Method of that: TCP sockets that linger for twenty seconds, because nobody reads at
+// their far end; they are sent before the listening socket comes to the listener, for after that newer kernels refuse
+// them.
 #include "os/EpollRunLoop.h"
 #include "service/ListenerWorld.h"
 #include "service/PassedSockets.h"
 #include "service/StatusSocket.h"
-#include "support/FewDescriptors.h"
-#include "support/ProcessResources.h"
 
-#include <sys/socket.h>
+#include <arpa/inet.h>
+#include <sys/wait.h>
 
 namespace zor::platform {
 namespace {
+
+using std::chrono::milliseconds;
 
 void echo(PeerConnection&, ServiceEvent& event) {
     if (event.reply)
@@ -39,7 +45,7 @@ TEST(ListenerSocket, IsMadeAtAnyPathWithItsMode) {
     ::umask(umaskBefore);
 }
 
-// Only a listening stream socket is taken over from the service manager; it is served with the sender check and stays.
+// Only a listening stream socket is taken over from the service manager; it is served and stays.
 TEST(ListenerSocket, PassedSocketsAreCheckedAndServed) {
     const SocketDirectory directory;
     KernelIdentity identity;
@@ -60,20 +66,29 @@ TEST(ListenerSocket, PassedSocketsAreCheckedAndServed) {
     // As the service manager passes it: blocking, and inherited.
     ASSERT_EQ(::fcntl(made, F_SETFL, 0), 0);
     ASSERT_EQ(::fcntl(made, F_SETFD, 0), 0);
-    const auto listener = listenerWith(made);
-    ASSERT_TRUE(listener->resume(echo));
     RawClient client(directory.socketPath());
-    EXPECT_TRUE(client.isServed());
-    listener->stop();
+    {
+        const auto listener = listenerWith(::dup(made));
+        ASSERT_TRUE(listener->resume(echo));
+        EXPECT_TRUE(client.isServed());
+    }
     EXPECT_NE(directory.modeOfSocket(), 0U);
+    // One that cannot start lets nobody in to wait for ever.
+    RawClient waits(directory.socketPath());
+    const auto listener = listenerWith(made);
+    {
+        const support::FewDescriptors none(0);
+        EXPECT_FALSE(listener->resume(echo));
+    }
+    EXPECT_TRUE(waits.ended());
 }
 
 /// A status socket on a run loop of its own.
 class StatusWorld {
 public:
-    explicit StatusWorld(StatusSocket::Build build) : status_(identity, loop_, std::move(build)) {
-        EXPECT_EQ(status_.open(directory.address()), 0);
-        thread_ = std::thread([this] { loop_.run(); });
+    explicit StatusWorld(StatusSocket::Build build, FileDescriptor passed = FileDescriptor())
+        : status_(identity, loop_, std::move(build)) {
+        EXPECT_EQ(passed.valid() ? status_.adopt(std::move(passed)) : status_.open(directory.address()), 0);
     }
     ~StatusWorld() {
         loop_.stop();
@@ -87,20 +102,24 @@ public:
 private:
     EpollRunLoop loop_;
     StatusSocket status_;
-    std::thread thread_;
+    std::thread thread_{[this] { loop_.run(); }};
 };
 
 // Clients that are silent, send rubbish, vanish at once or leave a large reply unread: each gets one frame about itself
-// and the end, and nothing is left open.
+// and the end, and nothing is left open. What does not fit into a socket's buffer costs the details, not the answer.
 TEST(ListenerStatus, EveryPeerGetsOneReplyAndTheEnd) {
     const support::ProcessResources before;
     {
-        StatusWorld world([](Peer& peer, StatusSocket::Detail) -> plist::Dictionary {
-            return {{"Peer", plist::Dictionary{{"PID", static_cast<std::uint64_t>(peer.pid())}}},
-                    {"Padding", plist::Data(300'000, 1)}};
+        std::atomic<bool> tooMuch{false};
+        StatusWorld world([&](Peer& peer, StatusSocket::Detail detail) -> plist::Dictionary {
+            plist::Dictionary reply = numbered(static_cast<std::uint64_t>(peer.pid()));
+            if (detail != StatusSocket::Detail::brief)
+                reply.set("Padding", plist::Data(tooMuch ? std::size_t{17} << 20 : 300'000, 1));
+            return reply;
         });
         std::vector<RawClient> unread;
-        for (int i = 0; i < 50; ++i) {
+        for (int i = 0; i < 51; ++i) {
+            tooMuch = i == 50;
             unread.emplace_back(world.directory.socketPath());
             RawClient(world.directory.socketPath()).close();
             RawClient client(world.directory.socketPath());
@@ -109,45 +128,13 @@ TEST(ListenerStatus, EveryPeerGetsOneReplyAndTheEnd) {
             const std::optional<Reply> reply = client.receive();
             ASSERT_TRUE(reply);
             EXPECT_EQ(reply->id, 0U);
-            EXPECT_EQ(reply->message.dictionary("Peer")->unsignedInteger("PID"),
-                      static_cast<std::uint64_t>(::getpid()));
+            EXPECT_EQ(reply->message.unsignedInteger("Number"), static_cast<std::uint64_t>(::getpid()));
+            EXPECT_EQ(reply->message.data("Padding") == nullptr, i == 50);
             EXPECT_TRUE(client.ended());
         }
         EXPECT_TRUE(eventually([&] { return world.identity.peers == 0; }));
     }
     EXPECT_EQ(before.leakedSince(), "");
-}
-
-// What does not fit into a socket's buffer costs a peer the details, not the answer.
-TEST(ListenerStatus, TooMuchIsToldBriefly) {
-    StatusWorld world([](Peer&, StatusSocket::Detail detail) -> plist::Dictionary {
-        if (detail == StatusSocket::Detail::brief)
-            return {{"Brief", true}};
-        return {{"Padding", plist::Data(std::size_t{17} << 20, 1)}};
-    });
-    RawClient client(world.directory.socketPath());
-    EXPECT_TRUE(client.receives(0, {{"Brief", true}}));
-    EXPECT_TRUE(client.ended());
-}
-
-// Goal: a listener that cannot start lets nobody in to wait for ever. Method: a passed socket with a client, and no
-// descriptor for anything else.
-TEST(ListenerSocket, ASocketThatCannotBeServedIsClosed) {
-    const support::TemporaryDirectory directory("/tmp");
-    const FileDescriptor opened(::open(directory.path().c_str(), O_PATH | O_CLOEXEC));
-    auto made = makeListenerSocket({.directory = opened.get(), .directoryPath = directory.path(), .name = "s"},
-                                   SOCK_STREAM, 0666);
-    ASSERT_TRUE(made);
-    RawClient client(directory.path() + "/s");
-    KernelIdentity identity;
-    ListenerOptions options;
-    options.passed = std::move(*made);
-    LinuxServiceListener listener(identity, std::move(options));
-    {
-        const support::FewDescriptors none(0);
-        EXPECT_FALSE(listener.resume([](PeerConnection&, ServiceEvent&) {}));
-    }
-    EXPECT_TRUE(client.ended());
 }
 
 // Sockets are taken only when they are meant for this process, by name, and none is inherited or left open.
@@ -183,6 +170,142 @@ TEST(PassedSockets, AreTakenByName) {
         EXPECT_FALSE(PassedSockets::of(variables, first).take("ipsi").valid()) << variables.pid << variables.count;
     EXPECT_EQ(::close(first), 0) << "what is another's is left alone";
     EXPECT_FALSE(PassedSockets::of({.pid = self, .count = "1", .names = "ipsi"}, first).take("ipsi").valid());
+}
+
+struct LingeringSocket {
+    LingeringSocket() {
+        const FileDescriptor listening(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+        sockaddr_in address = {
+            .sin_family = AF_INET, .sin_port = 0, .sin_addr = {::htonl(INADDR_LOOPBACK)}, .sin_zero = {}};
+        socklen_t length = sizeof address;
+        auto* const plain = reinterpret_cast<sockaddr*>(&address);
+        EXPECT_EQ(::bind(listening.get(), plain, length) | ::listen(listening.get(), 1), 0);
+        EXPECT_EQ(::getsockname(listening.get(), plain, &length) | ::connect(near.get(), plain, length), 0);
+        far.reset(::accept4(listening.get(), nullptr, nullptr, SOCK_CLOEXEC));
+        const linger lingering = {.l_onoff = 1, .l_linger = 20};
+        EXPECT_EQ(::setsockopt(near.get(), SOL_SOCKET, SO_LINGER, &lingering, sizeof lingering), 0);
+        const std::vector<char> bytes(1 << 16);
+        while (::send(near.get(), bytes.data(), bytes.size(), MSG_DONTWAIT) > 0) {
+        }
+    }
+    FileDescriptor near{::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)};
+    FileDescriptor far;
+};
+
+/// A listening socket as the service manager passes it, with clients that have sent a request and a lingering socket.
+class EarlyClients {
+public:
+    explicit EarlyClients(std::size_t count) {
+        // Not as the listener makes one: the kernel would refuse what is passed along.
+        const sockaddr_un address = addressOf(directory.socketPath());
+        EXPECT_EQ(::bind(listening.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+        EXPECT_EQ(::listen(listening.get(), 16), 0);
+        while (clients.size() < count) {
+            clients.emplace_back(directory.socketPath());
+            LingeringSocket lingering;
+            EXPECT_TRUE(sendWithDescriptor(clients.back().socket(), frameOf(numbered(1), 1), lingering.near.get()));
+            farEnds_.push_back(std::move(lingering.far));
+        }
+    }
+
+    const SocketDirectory directory;
+    FileDescriptor listening{::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)};
+    std::vector<RawClient> clients;
+
+private:
+    std::vector<FileDescriptor> farEnds_;
+};
+
+/// Answers each request with itself.
+struct Listening {
+    Listening(EarlyClients& early, const ListenerLimits& limits) {
+        world.identity.owner = static_cast<uid_t>(-1);
+        world.limits = limits;
+        world.start({}, std::move(early.listening));
+    }
+    ListenerWorld world;
+};
+
+// Goal: no thread waits for what lingers, and nothing of it stays open. Method: each way in which a thread can come to
+// close it.
+TEST(PassedAlong, HoldsNobody) {
+    using Act = std::function<void(EarlyClients&)>;
+    const std::pair<const char*, Act> rows[] = {
+        {"who receives it",
+         [](EarlyClients& early) {
+             // There can be no more threads.
+             const Listening listening(early, {.threadsRunning = 2, .threadsMax = 2});
+             for (RawClient& client : early.clients)
+                 EXPECT_TRUE(client.receive());
+         }},
+        {"the stop, while the watcher's ticks are too rare to free a thread",
+         [](EarlyClients& early) {
+             const Listening listening(early, {.threadsRunning = 2, .threadsMax = 2, .tick = milliseconds(1000)});
+             std::this_thread::sleep_for(milliseconds(100));
+         }},
+        {"the acceptor, which refuses all over the user's share",
+         [](EarlyClients& early) {
+             const Listening listening(early, {.connectionsMaxPerUser = 1});
+             EXPECT_TRUE(early.clients[0].receive());
+             for (std::size_t i = 1; i < early.clients.size(); ++i)
+                 EXPECT_TRUE(early.clients[i].ended());
+             early.clients[0].close();
+             EXPECT_TRUE(eventually([&] { return RawClient(early.directory.socketPath()).isServed(); }));
+         }},
+        {"the status's thread, which reads nothing",
+         [](EarlyClients& early) {
+             const StatusWorld status([](Peer&, StatusSocket::Detail) { return numbered(1); },
+                                      std::move(early.listening));
+             for (RawClient& client : early.clients)
+                 EXPECT_TRUE(client.receive());
+         }},
+    };
+    for (const auto& [who, act] : rows) {
+        SCOPED_TRACE(who);
+        EarlyClients early(4);
+        const support::ProcessResources before;
+        const auto begin = std::chrono::steady_clock::now();
+        act(early);
+        EXPECT_LT(std::chrono::steady_clock::now() - begin, milliseconds(10'000)) << "it waited for what lingers";
+        EXPECT_EQ(before.leakedSince(), "");
+    }
+}
+
+// Goal: nothing that another process sends over a socket it was given is served. Method: a whole request and the second
+// half of one, on a connection made before the listener had its socket, which has no credentials by itself, and after.
+TEST(PassedAlong, ToAnotherProcessIsNotThePeer) {
+    const plist::Data frame = frameOf(numbered(2), 2);
+    for (const bool isEarly : {true, false})
+        for (const std::size_t own : {std::size_t{0}, std::size_t{20}}) {
+            SCOPED_TRACE(own);
+            EarlyClients early(isEarly ? 1 : 0);
+            Listening listening(early, {.threadsRunning = 1, .threadsMax = 1});
+            RawClient client = isEarly ? std::move(early.clients[0]) : RawClient(early.directory.socketPath());
+            EXPECT_TRUE(isEarly ? client.receive().has_value() : client.isServed());
+            const int before = listening.world.counts.messages;
+            ASSERT_TRUE(client.send(partOf(frame, 0, own)));
+            const pid_t child = ::fork();
+            if (child == 0)
+                ::_exit(client.send(partOf(frame, own, frame.size())) ? 0 : 1);
+            EXPECT_TRUE(client.ended());
+            EXPECT_EQ(listening.world.counts.messages, before);
+            ::waitpid(child, nullptr, 0);
+        }
+}
+
+// Once the socket is the listener's the kernel refuses at the sender, if it can.
+TEST(PassedAlong, IsRefusedAtTheSender) {
+    constexpr int passRights = 83;
+    ListenerWorld world;
+    world.start();
+    int known = 0;
+    socklen_t length = sizeof known;
+    RawClient client = world.connect();
+    if (::getsockopt(client.socket(), SOL_SOCKET, passRights, &known, &length) != 0)
+        GTEST_SKIP() << "the kernel cannot";
+    EXPECT_FALSE(sendWithDescriptor(client.socket(), frameOf(numbered(1), 1), 0));
+    EXPECT_EQ(errno, EPERM);
+    EXPECT_TRUE(client.isServed());
 }
 
 } // namespace

@@ -3,24 +3,26 @@
 // what the kernel says, and raw clients that may send any bytes.
 #pragma once
 
+#include "base/BlockingScope.h"
 #include "plist/Binary.h"
 #include "service/LinuxServiceListener.h"
+#include "support/FewDescriptors.h"
 #include "support/FileTree.h"
+#include "support/Files.h"
 #include "support/Frames.h"
+#include "support/ProcessResources.h"
 #include "support/Waiting.h"
 
 #include <algorithm>
 #include <atomic>
-#include <cstring>
-#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <mutex>
-#include <poll.h>
+#include <random>
+#include <semaphore>
 #include <set>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
-#include <vector>
 
 namespace zor::platform {
 
@@ -42,14 +44,10 @@ public:
             return nullptr;
         return std::make_unique<KernelPeer>(*this, credentials);
     }
-    bool ownsRoot(uid_t uid) const override { return everybodyOwnsRoot || uid == owner_; }
+    bool ownsRoot(uid_t uid) const override { return !owner || uid == *owner; }
 
-    bool everybodyOwnsRoot = true;
-    /// Nobody else then.
-    void ownersAre(uid_t uid) {
-        everybodyOwnsRoot = false;
-        owner_ = uid;
-    }
+    /// Everybody when there is none.
+    std::optional<uid_t> owner;
     std::atomic<bool> knowsPeers{true};
     /// What every peer is granted.
     std::atomic<bool> kernelAgent{false};
@@ -76,17 +74,15 @@ private:
         KernelIdentity& owner_;
         const ucred credentials_;
     };
-
-    uid_t owner_ = static_cast<uid_t>(-1);
 };
 
 /// A directory for a socket, which has a path of so many bytes there.
 class SocketDirectory {
 public:
     explicit SocketDirectory(std::size_t pathBytes = 50) {
-        path_.resize(pathBytes - std::strlen("/s"), 'd');
-        ::mkdir(path_.c_str(), 0755);
-        descriptor_.reset(::open(path_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+        path_.resize(pathBytes - 2, 'd');
+        support::makeDirectory(AT_FDCWD, path_);
+        descriptor_ = support::openDirectory(path_);
     }
     ListenerAddress address() const { return {.directory = descriptor_.get(), .directoryPath = path_, .name = "s"}; }
     /// A path that fits an address, whatever the directory's does.
@@ -151,11 +147,6 @@ public:
         EXPECT_TRUE(frame->header.isValidReply());
         return Reply{.id = frame->header.id, .message = frame->message()};
     }
-    /// The same, when something comes within a few milliseconds.
-    std::optional<Reply> receiveIfAny() {
-        pollfd descriptor = {.fd = socket_.get(), .events = POLLIN, .revents = 0};
-        return ::poll(&descriptor, 1, 5) > 0 ? receive() : std::nullopt;
-    }
     /// Whether this is the next reply.
     bool receives(std::uint64_t id, const plist::Dictionary& message) {
         const std::optional<Reply> reply = receive();
@@ -204,11 +195,13 @@ public:
     ~ListenerWorld() { stop(); }
 
     /// Starts; `onMessage` gets the messages (the request comes back when it is empty), `counts` all events. That a
-    /// connection has one event at a time is checked for every one.
-    void start(MessageHandler onMessage = {}) {
+    /// connection has one event at a time is checked for every one. A socket that is `passed` takes the place of its
+    /// own.
+    void start(MessageHandler onMessage = {}, FileDescriptor passed = FileDescriptor()) {
         onMessage_ = std::move(onMessage);
         ListenerOptions options;
         options.address = directory_.address();
+        options.passed = std::move(passed);
         options.limits = limits;
         options.report = [this](std::string_view line) {
             const std::lock_guard lock(mutex_);
@@ -255,14 +248,11 @@ public:
         return clients;
     }
     ListenerCounters counters() const { return listener_->counters(); }
-    std::vector<std::string> reports() {
-        const std::lock_guard lock(mutex_);
-        return reports_;
-    }
     /// Waits until a report has these words.
     bool reports(std::string_view words) {
         return eventually([&] {
-            return std::ranges::any_of(reports(), [&](const std::string& line) { return line.contains(words); });
+            const std::lock_guard lock(mutex_);
+            return std::ranges::any_of(reports_, [&](const std::string& line) { return line.contains(words); });
         });
     }
 
