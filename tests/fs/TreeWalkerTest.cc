@@ -1,43 +1,31 @@
 // SPDX-License-Identifier: Apache-2.0
 // Goal: a walk sees every item once and nothing that is not in the tree, whatever the tree's owner does meanwhile.
-// Method: real trees, moved about between two visits by the visitor itself.
+// Method: real trees, moved about between two visits by the visitor itself. The same for the usage, which is a walk.
 #include "fs/TreeWalker.h"
 
+#include "fs/DiskUsage.h"
 #include "fs/TreeWorld.h"
 
-#include <algorithm>
-#include <fcntl.h>
-#include <functional>
-#include <gtest/gtest.h>
-#include <map>
-#include <sched.h>
-#include <set>
 #include <sys/mount.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 namespace zor::fs::test {
 namespace {
 
-const char* text(WalkEntryKind kind) {
-    static const std::map<WalkEntryKind, const char*> texts = {{WalkEntryKind::directory, "directory"},
-                                                               {WalkEntryKind::directoryEnd, "end"},
-                                                               {WalkEntryKind::unreadableDirectory, "unreadable"},
-                                                               {WalkEntryKind::file, "file"},
-                                                               {WalkEntryKind::symbolicLink, "link"},
-                                                               {WalkEntryKind::other, "other"},
-                                                               {WalkEntryKind::noStatus, "no status"}};
-    return texts.at(kind);
-}
-
-/// "kind path" of every visit, sorted, since a directory has no order of its own.
-std::vector<std::string> visits(TreeWalker& walker, int parent, const char* name) {
-    std::vector<std::string> seen;
+/// "kind path" of every visit.
+std::set<std::string> visits(TreeWalker& walker, int parent, const char* name) {
+    static const std::map<WalkEntryKind, const char*> texts = {{WalkEntryKind::directory, "directory "},
+                                                               {WalkEntryKind::directoryEnd, "end "},
+                                                               {WalkEntryKind::unreadableDirectory, "unreadable "},
+                                                               {WalkEntryKind::file, "file "},
+                                                               {WalkEntryKind::symbolicLink, "link "},
+                                                               {WalkEntryKind::other, "other "},
+                                                               {WalkEntryKind::noStatus, "no status "}};
+    std::set<std::string> seen;
     walker.walk(parent, name, [&](const WalkEntry& entry) {
-        seen.push_back(std::string(text(entry.kind)) + " " + entry.path() + (entry.onOtherFileSystem ? " (away)" : ""));
+        EXPECT_TRUE(
+            seen.insert(texts.at(entry.kind) + entry.path() + (entry.onOtherFileSystem ? " (away)" : "")).second);
         return WalkStep::proceed;
     });
-    std::sort(seen.begin(), seen.end());
     return seen;
 }
 
@@ -48,18 +36,16 @@ TEST(TreeWalker, VisitsEveryItemOfATree) {
     makeItems(root.get(), {"tree/", "tree/empty/", "tree/full/", "tree/full/.hidden", "tree/full/dangling -> nowhere",
                            "tree/full/up -> ..", "tree/fifo|"});
     ASSERT_EQ(::mknodat(root.get(), "tree/socket", S_IFSOCK | 0600, 0), 0);
-    const std::vector<std::string> expected = {
+    const std::set<std::string> expected = {
         "directory ",        "directory empty",    "directory full", "end ",       "end empty",   "end full",
         "file full/.hidden", "link full/dangling", "link full/up",   "other fifo", "other socket"};
     for (const WalkStatus status : {WalkStatus::full, WalkStatus::typeOnly}) {
         TreeWalker walker(status);
-        auto sorted = expected;
-        std::sort(sorted.begin(), sorted.end());
-        EXPECT_EQ(visits(walker, root.get(), "tree"), sorted);
+        EXPECT_EQ(visits(walker, root.get(), "tree"), expected);
         const FileDescriptor tree = openDirectory(root.get(), "tree");
-        EXPECT_EQ(visits(walker, tree.get(), "."), sorted);
-        EXPECT_EQ(visits(walker, root.get(), "tree/full/.hidden"), std::vector<std::string>{"file "});
-        EXPECT_EQ(visits(walker, root.get(), "tree/full/up"), std::vector<std::string>{"link "});
+        EXPECT_EQ(visits(walker, tree.get(), "."), expected);
+        EXPECT_EQ(visits(walker, root.get(), "tree/full/.hidden"), std::set<std::string>{"file "});
+        EXPECT_EQ(visits(walker, root.get(), "tree/full/up"), std::set<std::string>{"link "});
     }
     TreeWalker walker;
     const auto proceed = [](const WalkEntry&) { return WalkStep::proceed; };
@@ -69,20 +55,18 @@ TEST(TreeWalker, VisitsEveryItemOfATree) {
               -ECANCELED);
 }
 
-struct Move {
-    const char* name;
-    /// Depths in the chain whose directories are moved out when the bottom is reached, in this order.
-    std::vector<std::size_t> depths;
-    /// Levels that cannot be returned to.
-    std::size_t lost;
-    /// What takes the moved directory's name: a link to where it is now, or other directories of the same names.
-    bool decoys = false;
-};
-
 // Directories moved away while the walk is below them, deeper than it keeps descriptors: it goes on where it may,
 // leaves what is lost, and never goes up into the place they were moved to.
 TEST(TreeWalker, GoesUpOnlyIntoDirectoriesItCameFrom) {
-    const Move moves[] = {
+    const struct {
+        const char* name;
+        /// Depths in the chain whose directories are moved out when the bottom is reached, in this order.
+        std::vector<std::size_t> depths;
+        /// Levels that cannot be returned to.
+        std::size_t lost;
+        /// The moved directory's name is taken by a link to its new place, or by other directories of the same names.
+        bool decoys = false;
+    } moves[] = {
         {.name = "none", .depths = {}, .lost = 0},
         {.name = "its \"..\" leads out, its parent is where it was", .depths = {20}, .lost = 0},
         // The first move makes ".." useless at depth 20, the second the names at depth 10: 10 to 20 are gone.
@@ -91,7 +75,7 @@ TEST(TreeWalker, GoesUpOnlyIntoDirectoriesItCameFrom) {
         {.name = "near the bottom, still open", .depths = {50}, .lost = 0},
         {.name = "several", .depths = {30, 20, 10, 2}, .lost = 29},
     };
-    for (const Move& move : moves) {
+    for (const auto& move : moves) {
         World world;
         world.makeTree();
         std::vector<ino_t> chain;
@@ -126,40 +110,6 @@ TEST(TreeWalker, GoesUpOnlyIntoDirectoriesItCameFrom) {
     }
 }
 
-// A name that changes its kind between the reading of the directory and its turn is visited as what it is now.
-TEST(TreeWalker, VisitsWhatANameIsNow) {
-    World world;
-    makeDirectory(world.fd(), "tree");
-    constexpr int count = 9;
-    for (int i = 0; i < count; ++i)
-        makeDirectory(world.fd(), "tree/" + std::to_string(i));
-    std::map<std::string, std::string> kinds;
-    std::map<std::string, std::string> expected;
-    TreeWalker walker;
-    walker.walk(world.fd(), "tree", [&](const WalkEntry& entry) {
-        if (entry.depth == 0)
-            return WalkStep::proceed;
-        for (int i = 0; expected.empty() && i < count; ++i) {
-            const std::string name = std::to_string(i);
-            const std::string path = "tree/" + name;
-            if (name == entry.name)
-                continue;
-            EXPECT_EQ(::unlinkat(world.fd(), path.c_str(), AT_REMOVEDIR), 0);
-            if (i % 3 == 0)
-                makeLink(world.fd(), path, world.path() + "/outside");
-            if (i % 3 == 1)
-                makeFifo(world.fd(), path);
-        }
-        if (expected.empty()) {
-            expected = {{"0", "link"}, {"3", "link"}, {"6", "link"}, {"1", "other"}, {"4", "other"}, {"7", "other"}};
-            expected[entry.name] = "end";
-        }
-        kinds[entry.name] = text(entry.kind);
-        return WalkStep::proceed;
-    });
-    EXPECT_EQ(kinds, expected);
-}
-
 // Mount points, of another file system and of this one (a loop), and a mount on a file: shown, not entered.
 TEST(TreeWalker, DoesNotCrossMounts) {
     World world;
@@ -174,11 +124,52 @@ TEST(TreeWalker, DoesNotCrossMounts) {
         const FileDescriptor root = openDirectory(world.path());
         TreeWalker walker;
         EXPECT_EQ(visits(walker, root.get(), "tree"),
-                  (std::vector<std::string>{"directory ", "directory loop (away)", "directory other (away)", "end ",
-                                            "end loop (away)", "end other (away)", "file file (away)"}));
+                  (std::set<std::string>{"directory ", "directory loop (away)", "directory other (away)", "end ",
+                                         "end loop (away)", "end other (away)", "file file (away)"}));
     });
     if (!permitted)
         GTEST_SKIP() << "mounting is not permitted";
+}
+
+// Goal: the usage is what files, links and FIFOs occupy, hard links once, and the log says what was left out. Method:
+// against a plain sum; then the tree is changed from inside the log.
+TEST(Usage, CountsAllocatedBytesOnce) {
+    const TemporaryDirectory directory("/tmp");
+    const FileDescriptor root = openDirectory(directory.path());
+    makeItems(root.get(), {"a/", "a/b/", "empty/"});
+    makeFile(root.get(), "a/file", std::string(10'000, 'x'));
+    makeFile(root.get(), "a/b/.hidden", std::string(100'000, 'x'));
+    makeFile(root.get(), "twice", std::string(50'000, 'x'));
+    ASSERT_EQ(::linkat(root.get(), "twice", root.get(), "a/again", 0), 0);
+    makeLink(root.get(), "link", "/dev/shm");
+    makeLink(root.get(), "long", std::string(4000, 'x'));
+    makeFifo(root.get(), "fifo");
+    const FileDescriptor sparse(::openat(root.get(), "sparse", O_WRONLY | O_CREAT | O_CLOEXEC, 0600));
+    ASSERT_EQ(::ftruncate(sparse.get(), 1'000'000'000), 0);
+    std::uint64_t expected = 0;
+    for (const char* path : {"a/file", "a/b/.hidden", "twice", "link", "long", "fifo", "sparse"})
+        expected += allocated(root.get(), path);
+    EXPECT_EQ(diskUsage(root.get(), "/r", {}).bytes, expected);
+    std::set<std::string> lines;
+    const auto write = [&](int level, const std::string& message) {
+        lines.insert(std::to_string(level) + " " + message.substr(0, message.find(" : ")));
+        // The first line comes from the root's entries, before any directory below is opened.
+        if (lines.size() == 1) {
+            ::unlinkat(root.get(), "empty", AT_REMOVEDIR);
+            ::renameat(root.get(), "a", root.get(), "elsewhere");
+            makeLink(root.get(), "a", "elsewhere");
+        }
+    };
+    makeDirectory(root.get(), "b");
+    ASSERT_EQ(::linkat(root.get(), "twice", root.get(), "b/again", 0), 0);
+    ASSERT_EQ(::linkat(root.get(), "twice", root.get(), "thrice", 0), 0);
+    expected -= allocated(root.get(), "a/file") + allocated(root.get(), "a/b/.hidden");
+    EXPECT_EQ(diskUsage(root.get(), "/r", {.write = write, .levelMax = 7}).bytes, expected);
+    EXPECT_TRUE(lines.erase("7 Skipping hardlinked file at /r/thrice") +
+                    lines.erase("7 Skipping hardlinked file at /r/twice") ==
+                1);
+    EXPECT_EQ(lines, (std::set<std::string>{"3 Failed to open directory /r/a", "3 Failed to open directory /r/empty",
+                                            "7 Skipping hardlinked file at /r/b/again"}));
 }
 
 } // namespace

@@ -1,11 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/TreeWorld.h"
 
-#include <chrono>
-#include <cstdio>
-#include <cstdlib>
-#include <fcntl.h>
-#include <gtest/gtest.h>
 #include <random>
 #include <sched.h>
 #include <sys/mount.h>
@@ -27,9 +22,7 @@ std::string upwards(std::size_t levels) {
 
 /// `enter` says whether it could.
 bool inChild(const std::function<bool()>& enter, const std::function<void()>& body) {
-    constexpr int passed = 0;
-    constexpr int failed = 1;
-    constexpr int notPermitted = 2;
+    enum { passed, failed, notPermitted };
     std::fflush(nullptr);
     const pid_t child = checked(::fork(), "fork");
     if (child == 0) {
@@ -52,14 +45,10 @@ bool inChild(const std::function<bool()>& enter, const std::function<void()>& bo
 
 } // namespace
 
-std::size_t repeatForRace(const std::function<void()>& body, const std::function<bool()>& isEnough) {
+void repeatForRace(const std::function<void()>& body, const std::function<bool()>& isEnough) {
     const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(support::raceSeconds());
-    std::size_t times = 0;
-    while (std::chrono::steady_clock::now() < end && !testing::Test::HasFailure() && !(isEnough && isEnough())) {
+    while (std::chrono::steady_clock::now() < end && !testing::Test::HasFailure() && !(isEnough && isEnough()))
         body();
-        ++times;
-    }
-    return times;
 }
 
 std::size_t openDescriptorCount() {
@@ -77,25 +66,11 @@ struct stat statusOf(int parent, const std::string& path) {
     return status;
 }
 
-struct stat statusOf(const std::string& path) {
-    return statusOf(AT_FDCWD, path);
-}
-
 bool inMountNamespace(const std::function<void()>& body) {
     const auto enter = [] {
         return ::unshare(CLONE_NEWNS) == 0 && ::mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0;
     };
     return inChild(enter, body);
-}
-
-void makeChain(int parent, std::size_t depth) {
-    FileDescriptor current;
-    for (std::size_t level = 0; level < depth; ++level) {
-        const int above = level == 0 ? parent : current.get();
-        checked(::mkdirat(above, "d", 0755), "mkdir");
-        current = openDirectory(above, "d");
-        checked(::mknodat(current.get(), "f", S_IFREG | 0644, 0), "mknod");
-    }
 }
 
 std::string chainPath(std::size_t depth) {
@@ -144,16 +119,22 @@ bool World::confined(const std::function<void()>& body) {
     return inChild(enter, body);
 }
 
-std::string World::outside() const {
-    return support::readTree(path() + "/outside", {"parking/moved"}).describe();
-}
-
 std::string World::damage() const {
     const std::string now = outside();
     return now == before_ ? "" : "outside was\n" + before_ + "and is\n" + now;
 }
 
-Vandal::Vandal(const World& world) : world_(world), thread_([this] { run(); }) {
+Vandal::Vandal(const World& world) : world_(world) {
+    thread_ = std::thread([this] {
+        std::mt19937 random(static_cast<unsigned>(::getpid()));
+        while (!stopped_) {
+            for (int exchanges = 0; exchanges < 100 && !stopped_; ++exchanges)
+                exchange(random());
+            begun_ = true;
+            replaceFile(random());
+            moveOutAndBack(random());
+        }
+    });
     while (!begun_)
         std::this_thread::yield();
 }
@@ -161,17 +142,6 @@ Vandal::Vandal(const World& world) : world_(world), thread_([this] { run(); }) {
 Vandal::~Vandal() {
     stopped_ = true;
     thread_.join();
-}
-
-void Vandal::run() {
-    std::mt19937 random(static_cast<unsigned>(::getpid()));
-    while (!stopped_) {
-        for (int exchanges = 0; exchanges < 100 && !stopped_; ++exchanges)
-            exchange(random());
-        begun_ = true;
-        replaceFile(random());
-        moveOutAndBack(random());
-    }
 }
 
 /// A directory of the chain stands in outside/parking for a moment, with a link to there in its place.

@@ -3,15 +3,18 @@
 // change, and an owner of the tree who moves it about meanwhile.
 #pragma once
 
+#include "fs/RecursiveRemove.h"
 #include "os/LinuxDisk.h"
+#include "support/FaultDisk.h"
 #include "support/FileTree.h"
 #include "support/Files.h"
 #include "support/LongRun.h"
+#include "support/ProcessResources.h"
 
+#include <algorithm>
 #include <atomic>
-#include <functional>
-#include <string>
-#include <sys/stat.h>
+#include <fcntl.h>
+#include <gtest/gtest.h>
 #include <thread>
 
 namespace zor::fs::test {
@@ -27,17 +30,17 @@ using support::makeLink;
 using support::openDirectory;
 using support::TemporaryDirectory;
 
-/// Calls `body` again and again for a while, until it is enough or fails; how often.
-std::size_t repeatForRace(const std::function<void()>& body, const std::function<bool()>& isEnough = nullptr);
+/// Calls `body` again and again for a while, until it is enough or fails.
+void repeatForRace(const std::function<void()>& body, const std::function<bool()>& isEnough = nullptr);
 std::size_t openDescriptorCount();
 struct stat statusOf(int parent, const std::string& path);
-struct stat statusOf(const std::string& path);
+inline std::uint64_t allocated(int parent, const std::string& path) {
+    return static_cast<std::uint64_t>(statusOf(parent, path).st_blocks) * 512;
+}
 
 /// Runs `body` in a child with mounts of its own. False: not permitted here. What `body` expects in vain is a failure.
 bool inMountNamespace(const std::function<void()>& body);
 
-/// A chain of `depth` directories "d", the first in `parent`; each holds a file "f" as well.
-void makeChain(int parent, std::size_t depth);
 /// "a0", "a0/a1" and so on.
 std::string chainPath(std::size_t depth);
 
@@ -66,8 +69,9 @@ public:
     platform::LinuxDisk disk{platform::Syncs::off};
 
 private:
-    [[nodiscard]] std::string outside() const;
-
+    [[nodiscard]] std::string outside() const {
+        return support::readTree(path() + "/outside", {"parking/moved"}).describe();
+    }
     TemporaryDirectory directory_;
     bool confined_ = false;
     FileDescriptor root_;
@@ -84,7 +88,6 @@ public:
     Vandal& operator=(const Vandal&) = delete;
 
 private:
-    void run();
     void moveOutAndBack(unsigned random);
     void exchange(unsigned random);
     void replaceFile(unsigned random);
