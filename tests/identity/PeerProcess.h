@@ -3,8 +3,8 @@
 #pragma once
 
 #include "identity/LinuxPeerIdentity.h"
-#include "os/FileDescriptor.h"
 #include "os/Names.h"
+#include "support/FewDescriptors.h"
 #include "support/RecordingLog.h"
 #include "support/TestRoot.h"
 #include "support/Waiting.h"
@@ -48,11 +48,6 @@ private:
     socklen_t length_ = sizeof address_;
 };
 
-/// Copies a program, so that its inode is the copy's alone.
-inline void copyProgram(const std::string& from, const std::string& to) {
-    std::filesystem::copy_file(from, to);
-}
-
 struct PeerStart {
     /// As whom it runs, when the test is root.
     uid_t uid = ::geteuid();
@@ -74,7 +69,11 @@ public:
         int ends[2] = {};
         EXPECT_EQ(::pipe2(ends, O_CLOEXEC), 0);
         const FileDescriptor connection(::socket(AF_UNIX, SOCK_STREAM, 0));
-        pid_ = start.number == 0 ? ::fork() : forkAs(start.number);
+        clone_args asNumbered{};
+        asNumbered.exit_signal = SIGCHLD;
+        asNumbered.set_tid = reinterpret_cast<std::uintptr_t>(&start.number);
+        asNumbered.set_tid_size = 1;
+        pid_ = start.number == 0 ? ::fork() : static_cast<pid_t>(::syscall(SYS_clone3, &asNumbered, sizeof asNumbered));
         if (pid_ == 0) {
             const bool ready = (start.uid == ::geteuid() || ::setresuid(start.uid, start.uid, start.uid) == 0) &&
                                (!start.prepare || start.prepare()) &&
@@ -109,8 +108,7 @@ public:
         if (pid_ <= 0)
             return;
         kill();
-        ::waitpid(pid_, nullptr, 0);
-        pid_ = -1;
+        ::waitpid(std::exchange(pid_, -1), nullptr, 0);
     }
 
 private:
@@ -119,32 +117,27 @@ private:
         std::error_code ignored;
         return eventually([&] { return std::filesystem::equivalent(program, link, ignored); });
     }
-    static pid_t forkAs(pid_t number) {
-        clone_args arguments{};
-        arguments.exit_signal = SIGCHLD;
-        arguments.set_tid = reinterpret_cast<std::uintptr_t>(&number);
-        arguments.set_tid_size = 1;
-        return static_cast<pid_t>(::syscall(SYS_clone3, &arguments, sizeof arguments));
-    }
-
     pid_t pid_ = -1;
     FileDescriptor commands_;
     FileDescriptor accepted_;
 };
 
-/// Whom a peer's own uid counts as: the owner of the root, or some user.
-enum class PeerIs { owner, user };
-
 /// A root with a registry and some programs, "agent", "other" and "sleeper".
 struct PeerWorld {
-    explicit PeerWorld(PeerIs peers = PeerIs::user, uid_t peerUid = ::geteuid())
-        // A peer counts as the owner when its uid is the daemon's. uid 0 always does.
-        : identity(registry, peers == PeerIs::owner ? peerUid : peerUid + 1000) {
-        copyProgram("/bin/sh", program("agent"));
-        copyProgram("/bin/sh", program("other"));
-        copyProgram("/bin/sleep", program("sleeper"));
+    /// Peers of this uid count as the owner of the root. uid 0 always does.
+    explicit PeerWorld(uid_t owner = ::geteuid() + 1000) : identity(registry, owner) {
+        for (const auto& [name, from] :
+             {std::pair("agent", "/bin/sh"), {"other", "/bin/sh"}, {"sleeper", "/bin/sleep"}})
+            copyProgram(from, name);
     }
-    [[nodiscard]] std::string program(const std::string& name) const { return test.path(name); }
+    /// Its inode is the copy's alone.
+    void copyProgram(const std::string& from, const std::string& name) const {
+        std::filesystem::copy_file(from, program(name));
+    }
+    /// One of the root's, or of the machine's by its path.
+    [[nodiscard]] std::string program(const std::string& name) const {
+        return name.starts_with('/') ? name : test.path(name);
+    }
     [[nodiscard]] std::string entry(const std::string& name, const std::string& more = "") const {
         return "<plist version=\"1.0\"><dict><key>Executable</key><string>" + program(name) + "</string>" + more +
                "</dict></plist>";

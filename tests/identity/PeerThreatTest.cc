@@ -18,20 +18,21 @@ bool putOver(const std::string& at, const std::string& shown) {
            ::mount(shown.c_str(), at.c_str(), nullptr, MS_BIND, nullptr) == 0;
 }
 
-bool canMount(const PeerWorld& world) {
-    const pid_t child = ::fork();
-    if (child == 0)
-        ::_exit(putOver(world.program("agent"), world.program("other")) ? 0 : 1);
-    int status = 1;
+/// Of a child that exits with it.
+int exitStatusOf(pid_t child) {
+    int status = 0;
     ::waitpid(child, &status, 0);
-    return status == 0;
+    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
 // A peer is judged by the file that it runs, not by the name that this has in a mount namespace of the peer's own.
 TEST(PeerThreat, NamesInAnotherMountNamespace) {
     PeerWorld world;
     world.registerAs("agent.plist", "agent", "agent");
-    if (::geteuid() != 0 || !canMount(world))
+    const pid_t tries = ::fork();
+    if (tries == 0)
+        ::_exit(::geteuid() == 0 && putOver(world.program("agent"), world.program("other")) ? 0 : 1);
+    if (exitStatusOf(tries) != 0)
         GTEST_SKIP() << "needs root and a root that is a mount point: mounts in a namespace of their own";
     const auto judged = [&](const std::string& at, const std::string& shown) {
         const PeerProcess process(world.server, at, {.prepare = [&] { return putOver(at, shown); }, .runs = shown});
@@ -97,9 +98,7 @@ TEST(PeerThreat, AProgramThatGivesAGroup) {
 TEST(PeerThreat, AnAddressSpaceThatOutlivesTheProgram) {
     PeerWorld world;
     const std::string self = std::filesystem::read_symlink("/proc/self/exe");
-    world.test.replace(PeerWorld::pathOf("self.plist"), "<plist version=\"1.0\"><dict><key>Executable</key><string>" +
-                                                            self + "</string><key>Identifier</key><string>self" +
-                                                            "</string></dict></plist>");
+    world.registerAs("self.plist", self, "self");
     int ends[2] = {};
     ASSERT_EQ(::pipe2(ends, O_CLOEXEC), 0);
     const FileDescriptor reading(ends[0]);
@@ -129,21 +128,14 @@ TEST(PeerThreat, NumbersOfAnotherPidNamespace) {
     PeerWorld world;
     std::error_code ignored;
     const std::string first = std::filesystem::read_symlink("/proc/1/exe", ignored);
-    world.test.replace(PeerWorld::pathOf("first.plist"),
-                       "<plist version=\"1.0\"><dict><key>Executable</key><string>" + first +
-                           "</string><key>Identifier</key><string>first</string></dict></plist>");
-    const auto outcomeOf = [](pid_t child) {
-        int status = 0;
-        ::waitpid(child, &status, 0);
-        return WIFEXITED(status) ? WEXITSTATUS(status) : cannot;
-    };
+    world.registerAs("first.plist", first, "first");
     const pid_t outer = ::fork();
     if (outer == 0) {
         if (::geteuid() != 0 || ::unshare(CLONE_NEWPID) != 0)
             ::_exit(cannot);
         const pid_t inner = ::fork();
         if (inner > 0)
-            ::_exit(outcomeOf(inner));
+            ::_exit(exitStatusOf(inner));
         const FileDescriptor client(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
         if (LinuxPeerIdentity::procIsOurs() || world.server.connect(client.get()) != 0)
             ::_exit(isSomebody);
@@ -151,7 +143,7 @@ TEST(PeerThreat, NumbersOfAnotherPidNamespace) {
         const auto peer = world.identity.peerOfSocket(accepted.get());
         ::_exit(!peer || who(*peer) == "-" ? isNobody : isSomebody);
     }
-    const int outcome = outcomeOf(outer);
+    const int outcome = exitStatusOf(outer);
     if (outcome == cannot)
         GTEST_SKIP() << "needs root and pid namespaces";
     EXPECT_EQ(outcome, isNobody);
