@@ -33,11 +33,6 @@ struct zorvane_result {
     std::optional<std::string> nextPage;
 };
 
-// None of it is an interface of the library's.
-namespace zorvane {
-namespace [[gnu::visibility("hidden")]] c {}
-} // namespace zorvane
-
 namespace zorvane::c {
 
 class Session;
@@ -49,7 +44,9 @@ struct zorvane_request {
     zorvane::c::Run run;
 };
 
-namespace zorvane::c {
+namespace zorvane {
+// None of it is an interface of the library's.
+namespace [[gnu::visibility("hidden")]] c {
 
 /// A connection that is made when it is first needed, and again after it has failed.
 class Session {
@@ -108,4 +105,5 @@ T guardedOr(T otherwise, Body&& body) noexcept {
     return reinterpret_cast<const zorvane_value*>(value);
 }
 
-} // namespace zorvane::c
+} // namespace c
+} // namespace zorvane

@@ -7,9 +7,11 @@
 #include <gtest/gtest.h>
 
 #include <cstring>
+#include <filesystem>
 #include <functional>
 #include <memory>
 #include <poll.h>
+#include <unistd.h>
 
 namespace zor::whole {
 namespace {
@@ -302,6 +304,48 @@ TEST(CInterface, SilenceHoldsNobodyUp) {
     EXPECT_FALSE(isReadable(async, 50));
     async.reset();
     EXPECT_EQ(answers.kinds, "5");
+}
+
+// Goal: programs of others build against the installed library as its packages say, and work. Method: the installed
+// examples, built with pkg-config and CMake, run one after the other as programs that the daemon knows.
+TEST(CInterface, InstalledForOthers) {
+    const std::string build = ZORVANE_BINARY_DIR;
+    if (::access((build + "/packaging/libzorvane.so").c_str(), F_OK) != 0)
+        GTEST_SKIP() << "this build has no library for others";
+    const support::TemporaryDirectory place("/tmp");
+    const std::string sources = ZORVANE_SOURCE_DIR;
+    const std::string python = std::filesystem::canonical("/usr/bin/python3");
+    const Outcome built = runProgram({sources + "/tests/client/consumers.sh", sources, build, place.path()});
+    ASSERT_EQ(built.exitStatus, 0) << built.output;
+    DaemonProcess daemon;
+    const auto known = [&](const std::string& program) {
+        daemon.registerProgram(
+            "30-" + program.substr(program.rfind('/') + 1), program,
+            "<key>Entitlements</key><dict><key>com.veltra.private.Zorvane.allowed</key><true/></dict>");
+    };
+    const std::vector<std::string> programs = {"c99", "cxx17", "notes-c", "notes-cxx", "notes-cxx23", "notes-glib"};
+    for (const std::string& program : programs)
+        known(place.path() + "/bin/" + program);
+    known(python);
+    daemon.start();
+    const auto run = [&](std::vector<std::string> words, const std::string& end) {
+        SCOPED_TRACE(words.back());
+        words.insert(words.begin(), {"/usr/bin/env", "LD_LIBRARY_PATH=" + place.path() + "/lib",
+                                     "PYTHONPATH=" + place.path() + "/usr/local/lib/python3/dist-packages"});
+        words.push_back(daemon.root());
+        const Outcome outcome = runProgram(words);
+        EXPECT_EQ(outcome.exitStatus, 0) << outcome.output;
+        EXPECT_TRUE(outcome.output.ends_with(end)) << outcome.output;
+    };
+    for (int starts = 0; const std::string& program : programs) {
+        const std::string path = place.path() + "/bin/" + program;
+        if (program != "notes-glib")
+            run({path}, ", start " + std::to_string(++starts) + "\n");
+        else if (::access(path.c_str(), X_OK) == 0)
+            run({path}, ", found\n");
+    }
+    run({python, sources + "/packaging/examples/python/notes.py"}, ", start 6\n");
+    run({python, sources + "/tests/client/commands.py"}, "");
 }
 
 } // namespace
