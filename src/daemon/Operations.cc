@@ -69,6 +69,7 @@ Operations::Operations(const Store& store, const platform::Platform& platform)
       deletion({.log = store.log,
                 .boundary = store.boundary,
                 .locks = store.locks,
+                .cache = store.cache,
                 .creation = creation,
                 .removal = removal,
                 .entitlementChange = entitlementChange}),

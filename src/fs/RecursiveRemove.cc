@@ -76,6 +76,10 @@ int Remover::remove(int directory, const char* name) {
 }
 
 WalkStep Remover::visit(const WalkEntry& entry) {
+    if (callbacks_.goOn && !callbacks_.goOn()) {
+        stopError_ = ECANCELED;
+        return WalkStep::stop;
+    }
     switch (entry.kind) {
     case WalkEntryKind::directory:
         // The doomed names of this depth belong to a directory before this one.
@@ -170,9 +174,10 @@ int removeTree(platform::Disk& disk, int directory, const char* name, const Remo
     return Remover(disk, callbacks).remove(directory, name);
 }
 
-int removeTree(platform::Disk& disk, int directory, const char* name) {
+int removeTree(platform::Disk& disk, int directory, const char* name, const std::function<bool()>& goOn) {
     int firstError = 0;
     RemoveCallbacks callbacks;
+    callbacks.goOn = goOn;
     callbacks.failed = [&](const RemoveFailure& failure) {
         if (firstError == 0)
             firstError = failure.error;

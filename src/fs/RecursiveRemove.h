@@ -34,14 +34,16 @@ struct RemoveCallbacks {
     /// Told, with its path as above, of each directory below the root whose immutable or append-only flag was in the
     /// way and was cleared. Optional.
     std::function<void(const std::string& path)> directoryMadeMutable;
+    /// Asked before each item; with the answer false the removal ends with -ECANCELED. Optional.
+    std::function<bool()> goOn;
 };
 
 /// 0 when everything was removed or answered for by `failed`; -ENOENT when there is no such item; after the answer
 /// `stop`, the negative error that was answered so; another -errno when the root could not be examined.
 int removeTree(platform::Disk& disk, int directory, const char* name, const RemoveCallbacks& callbacks);
 
-/// Removes what can be removed. 0, or the first error that kept an item, as -errno.
-int removeTree(platform::Disk& disk, int directory, const char* name);
+/// Removes what can be removed. 0, or the first error that kept an item, as -errno; `goOn` as above.
+int removeTree(platform::Disk& disk, int directory, const char* name, const std::function<bool()>& goOn = {});
 
 /// Clears the flags that keep an item from being removed, immutable and append-only, of a regular file or directory. 1
 /// when one was set and is cleared, 0 when none was (as on anything that cannot have them, links among them), or

@@ -86,7 +86,8 @@ public:
 
     // Removal, copy, move.
     /// Asked often by what may take long. After the answer false it ends with ECANCELED, as soon as what it leaves is
-    /// whole or hidden: the source of a copy stays, and what was copied is a leftover.
+    /// whole or hidden: the source of a copy stays, and what was copied is a leftover. A copy that has its name is a
+    /// success, and what is left of its source a leftover.
     using GoOn = std::function<bool()>;
     /// Removes a tree; what is missing is not missed. An item that cannot be removed lets the rest go and is the error.
     /// An immutable or append-only item is made mutable and removed. Absent URL: EFAULT.
@@ -173,7 +174,7 @@ private:
     Result<void> moveAcrossFileSystems(int fromDirectory, const FileURL& source, int toDirectory,
                                        const FileURL& destination, const GoOn& goOn);
     /// 0 or a negative errno: the source then has its name still, or is a hidden leftover.
-    int removeMovedSource(int fromDirectory, const FileURL& source, int toDirectory);
+    int removeMovedSource(int fromDirectory, const FileURL& source, int toDirectory, const GoOn& goOn);
     Result<bool> sourceIsMissing(const FileURL& source);
     /// Copies beside the destination and renames, so that a partial copy never has the final name.
     Result<void> copyTree(int fromDirectory, const FileURL& source, int toDirectory, const FileURL& destination,

@@ -200,13 +200,13 @@ Result<void> ZORFileManager::renameItem(int fromDirectory, const FileURL& source
 Result<void> ZORFileManager::moveAcrossFileSystems(int fromDirectory, const FileURL& source, int toDirectory,
                                                    const FileURL& destination, const GoOn& goOn) {
     TRY(copyTree(fromDirectory, source, toDirectory, destination, goOn));
-    const int removed = removeMovedSource(fromDirectory, source, toDirectory);
-    if (removed < 0)
+    const int removed = removeMovedSource(fromDirectory, source, toDirectory, goOn);
+    if (removed < 0 && removed != -ECANCELED)
         log_.write(logLevelError, __func__, "Failed to remove source %s : %s", source.c_str(), errorText(-removed));
     return {};
 }
 
-int ZORFileManager::removeMovedSource(int fromDirectory, const FileURL& source, int toDirectory) {
+int ZORFileManager::removeMovedSource(int fromDirectory, const FileURL& source, int toDirectory, const GoOn& goOn) {
     const auto synced = [this](int directory) {
         const auto listing = platform::openBeneath(directory, ".", O_RDONLY | O_DIRECTORY); // it may be O_PATH
         return listing ? disk_.sync(listing->get()) : -listing.error();
@@ -219,7 +219,7 @@ int ZORFileManager::removeMovedSource(int fromDirectory, const FileURL& source, 
                               hidden.c_str(), 0);
     if (status == 0)
         status = synced(fromDirectory);
-    return status < 0 ? status : fs::removeTree(disk_, fromDirectory, hidden.c_str());
+    return status < 0 ? status : fs::removeTree(disk_, fromDirectory, hidden.c_str(), goOn);
 }
 
 Result<void> ZORFileManager::_traverseDirectory(const FileURL& url,

@@ -17,6 +17,7 @@ constexpr const char* function = "stageForDeleteContainersWithUsers";
 Result<void> ContainerRemoval::stage(const ContainerToGo& container) {
     return needs_.boundary.run({function, __LINE__}, [&]() -> Result<void> {
         std::vector<FileURL> changed;
+        needs_.cache.prepare(container.userId, container.containerClass);
         auto staged = [&] {
             const AllIdentifiersWriteLock lock(needs_.locks);
             return stage(container, changed, lock);

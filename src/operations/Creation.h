@@ -90,7 +90,7 @@ private:
     };
     Result<void> checkRequest(const Caller& caller, std::uint32_t userId, const std::string* identifier,
                               ContainerClass containerClass);
-    /// createOrLookup under the lock.
+    /// createOrLookup under the lock. What that needs to know of this disk is read before it.
     Result<std::optional<FoundContainer>> lookedFor(const Wanted& wanted, std::optional<ContainerMaker::Built>* built);
     /// `built`: nullptr builds under the lock. Otherwise it is what the caller has built, or where it has nothing yet
     /// the answer is nothing when it has to build first; what is used of it is taken.

@@ -48,6 +48,8 @@ Result<void> Deletion::stageForDeleteContainersWithUsers(const DeletionBatch& ba
                              static_cast<long>(count), static_cast<long>(batch.classes.size()),
                              static_cast<long>(batch.identifiers.size()));
         Progress progress;
+        for (std::size_t index = 0; index < count && index < batch.users.size(); ++index)
+            prepare(batch, index);
         while (progress.next < count) {
             auto staged = [&] {
                 const AllIdentifiersWriteLock lock(needs_.locks);
@@ -60,6 +62,15 @@ Result<void> Deletion::stageForDeleteContainersWithUsers(const DeletionBatch& ba
         }
         return needs_.removal.conclude(std::move(progress.first), std::move(progress.changed));
     });
+}
+
+void Deletion::prepare(const DeletionBatch& batch, std::size_t index) {
+    if (!batch.classes[index] || !batch.identifiers[index])
+        return;
+    const auto containerClass = static_cast<ContainerClass>(*batch.classes[index]);
+    needs_.cache.prepare(batch.users[index], containerClass);
+    if (isBundleClass(containerClass))
+        needs_.entitlementChange.prepareRemoval(*batch.identifiers[index]);
 }
 
 Result<void> Deletion::stageNext(const DeletionBatch& batch, Progress& progress, const AllIdentifiersWriteLock& lock) {

@@ -45,6 +45,7 @@ public:
         const Log& log;
         ExceptionBoundary& boundary;
         ZORLocks& locks;
+        ZORContainerCache& cache;
         Creation& creation;
         ContainerRemoval& removal;
         EntitlementChange& entitlementChange;
@@ -62,6 +63,8 @@ public:
 
 private:
     struct Progress;
+    /// Reads what an element needs before the lock is taken.
+    void prepare(const DeletionBatch& batch, std::size_t index);
     /// The elements from the one on that is next, to the end, or to one whose entitlements have to be settled first.
     Result<void> stageNext(const DeletionBatch& batch, Progress& progress, const AllIdentifiersWriteLock& lock);
     Result<void> stageForDelete(const DeletionBatch& batch, Progress& progress, const AllIdentifiersWriteLock& lock);

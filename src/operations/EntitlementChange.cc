@@ -57,6 +57,7 @@ ErrorCode EntitlementChange::processEntitlements(const plist::Dictionary* entitl
         if (canBeProcessed(*identifier, options) &&
             needs_.entitlements.changesNothing(entitlements, *identifier, options))
             return ErrorCode::success;
+        prepare(*identifier);
         std::optional<Change> change;
         const ErrorCode code = [&] {
             const AllIdentifiersWriteLock lock(needs_.locks);
@@ -65,6 +66,23 @@ ErrorCode EntitlementChange::processEntitlements(const plist::Dictionary* entitl
         return change ? settle(*change) : code;
     });
     return processed ? *processed : processed.error().replyCode();
+}
+
+void EntitlementChange::prepare(const std::string& identifier) {
+    if (needs_.entitlements.identifierHasSystemContainer(identifier))
+        needs_.cache.prepare(needs_.configuration.users().system, ContainerClass::dataSystem, false);
+    needs_.groups.prepare(identifier);
+}
+
+void EntitlementChange::prepareRemoval(const std::string& identifier) {
+    for (const std::string& one : withChildren(identifier))
+        prepare(one);
+}
+
+std::vector<std::string> EntitlementChange::withChildren(const std::string& identifier) const {
+    std::vector<std::string> all{identifier};
+    std::ranges::move(needs_.entitlements.childrenOf(identifier), std::back_inserter(all));
+    return all;
 }
 
 ErrorCode EntitlementChange::settle(Change change) {
@@ -83,9 +101,7 @@ std::optional<EntitlementChange::Change>
 EntitlementChange::removeEntitlementDictionariesForIdentifierAndItsChildren(const std::string& identifier,
                                                                             const AllIdentifiersWriteLock& lock) {
     std::optional<Change> last;
-    std::vector<std::string> all{identifier};
-    std::ranges::move(needs_.entitlements.childrenOf(identifier), std::back_inserter(all));
-    for (const std::string& one : all) {
+    for (const std::string& one : withChildren(identifier)) {
         std::optional<Change> change;
         sayIfNotCleared(one, process(nullptr, one, nullptr, change, lock));
         last = std::max(last, change);

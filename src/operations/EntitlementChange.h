@@ -53,6 +53,8 @@ public:
     ErrorCode processEntitlements(const plist::Dictionary* entitlements, const std::string* identifier,
                                   const plist::Dictionary* options);
     using Change = ZOREntitlementMapping::Change;
+    /// Reads what the removal will have to know of containers, before the lock is taken.
+    void prepareRemoval(const std::string& identifier);
     /// Removes what is stored for an identifier and for the children recorded for it. The change that is to be settled
     /// when the lock is released (settleRemoval); nullopt for none. Failures are logged.
     std::optional<Change> removeEntitlementDictionariesForIdentifierAndItsChildren(const std::string& identifier,
@@ -63,6 +65,9 @@ public:
 private:
     /// The same of any change. Code 59.
     ErrorCode settle(Change change) ZOR_EXCLUDES(unsyncedMutex_);
+    /// What prepareRemoval does, for a change of one identifier.
+    void prepare(const std::string& identifier);
+    std::vector<std::string> withChildren(const std::string& identifier) const;
     void sayIfNotCleared(const std::string& identifier, ErrorCode code) const;
     /// `change` gets what is to be settled, if anything is.
     ErrorCode process(const plist::Dictionary* entitlements, const std::string& identifier,

@@ -63,6 +63,7 @@ Result<void> Replace::replaceContainer(const ReplaceRequest& request, StartDelet
 Result<void> Replace::checkedReplace(const ReplaceRequest& request, StartDeletionThread startDeletionThread) {
     Progress progress;
     TRY(checkReplace(request));
+    needs_.cache.prepare(request.userIdNew, request.classNew); // the old one's, too
     auto swapped = [&]() -> Result<void> {
         const AllIdentifiersWriteLock lock(needs_.locks);
         Result<void> result;

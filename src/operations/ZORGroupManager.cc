@@ -49,6 +49,12 @@ std::optional<ZORGroupManager::References> ZORGroupManager::_copyReferenceCountS
     return needs_.entitlements.groupReferences(type);
 }
 
+void ZORGroupManager::prepare(const std::string& identifier) {
+    for (const GroupType type : {GroupType::application, GroupType::system})
+        if (needs_.entitlements.mayHaveGroups(identifier, type))
+            forEachUser(type, [&](std::uint32_t userId) { needs_.cache.prepare(userId, classOf(type), false); });
+}
+
 void ZORGroupManager::handleChangeFromOldGroupContainerIds(Identifiers oldGroups, const Identifiers& newGroups,
                                                            GroupType type, const std::string& identifier,
                                                            std::vector<FileURL>& changed,
@@ -162,9 +168,10 @@ Result<ZORGroupManager::Paths> ZORGroupManager::groupContainerPathsForUser(std::
                              ZOR_SHOWN(*identifier), static_cast<unsigned long long>(error.replyCode()));
         };
         std::vector<FoundContainer> containers;
+        const bool system = userId == needs_.configuration.users().system;
+        needs_.cache.prepare(userId, classOf(system ? GroupType::system : GroupType::application), false);
         {
             const AllIdentifiersWriteLock lock(needs_.locks);
-            const bool system = userId == needs_.configuration.users().system;
             const auto groups = system ? needs_.entitlements.systemGroupIdentifiersForIdentifier(*identifier)
                                        : needs_.entitlements.appGroupIdentifiersForIdentifier(*identifier);
             // Whoever may ask at all may ask for any identifier's: a path opens nothing, its directory has an owner.

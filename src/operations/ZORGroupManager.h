@@ -58,6 +58,8 @@ public:
     Result<std::vector<std::string>> groupContainerIdentifiersForUser(std::uint32_t userId,
                                                                       const std::string* identifier);
 
+    /// For who is about to change the entitlements of an identifier, without a lock: has read what the next needs.
+    void prepare(const std::string& identifier);
     /// Stages the containers of groups that lose their last reference by a change of `identifier` that has not been
     /// applied: the map still holds what was before. `changed` as ContainerRemoval::stage has it.
     void handleChangeFromOldGroupContainerIds(Identifiers oldGroups, const Identifiers& newGroups, GroupType type,

@@ -10,6 +10,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <exception>
 #include <fcntl.h>
 #include <set>
 
@@ -30,6 +31,9 @@ constexpr int lookOverShare = 100;
 
 /// The look for a metadata file gives this for something else in its place; no errno.
 constexpr int isNoFile = -1;
+
+/// A class directory is read so often in a row while operations change the class meanwhile.
+constexpr int readsMax = 16;
 
 long number(ContainerClass containerClass) {
     return static_cast<long>(containerClass);
@@ -72,35 +76,96 @@ bool ZORContainerCache::isLeftOpen(const ZORError& error, const Key& key) const 
            (home && home->lookIfDue().state == UserHome::State::missing);
 }
 
-Result<ZORContainerCache::ClassCache*> ZORContainerCache::_getCacheForUserId(const Key& key) {
+ZORContainerCache::ClassCache* ZORContainerCache::knownCache(const Key& key) {
+    const UserHome* const home = homeOf(key);
+    const auto known = caches_.find(key);
+    const bool counts = known != caches_.end() && (!home || known->second.homeGeneration == home->generation());
+    return counts ? &known->second : nullptr;
+}
+
+template <typename Read>
+auto ZORContainerCache::readUnlocked(const Key& key, Read&& read) {
+    const platform::BlockingScope blocking;
+    std::optional<decltype(read())> result;
+    std::exception_ptr thrown;
+    beingRead_.insert(key);
+    cacheLock_.unlock();
+    try {
+        result.emplace(read());
+    } catch (...) {
+        thrown = std::current_exception();
+    }
+    cacheLock_.lock();
+    beingRead_.erase(key);
+    readEnded_.broadcast();
+    if (thrown)
+        std::rethrow_exception(thrown);
+    return std::move(*result);
+}
+
+Result<ZORContainerCache::ClassCache*> ZORContainerCache::_getCacheForUserId(const Key& key, Wanted wanted) {
     if (!configuration_.users().mayOwn(key.containerClass, key.userId))
         return makeError(log_, ZOR_HERE, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
                          "Invalid cache get-userId %u for class %ld", key.userId, number(key.containerClass));
-    const UserHome* const home = homeOf(key);
-    const auto known = caches_.find(key);
-    if (known != caches_.end() && (!home || known->second.homeGeneration == home->generation()))
-        return &known->second;
-    ZOR_LOG(log_, logLevelDebug, "Rebuilding container class cache: %u-%s%s", key.userId, className(key.containerClass),
-            suffix(key.transient));
-    const platform::BlockingScope blocking;
-    ClassCache built = TRY(readClassDirectory(key));
-    return &caches_.insert_or_assign(key, std::move(built)).first->second;
+    for (int reads = 0; reads < readsMax;) {
+        ClassCache* const before = knownCache(key);
+        if (before && (wanted == Wanted::asKnown || !before->hidesSome))
+            return before;
+        if (beingRead_.contains(key)) {
+            const platform::BlockingScope blocking;
+            readEnded_.wait(cacheLock_);
+            continue;
+        }
+        ++reads;
+        if (!before)
+            ZOR_LOG(log_, logLevelDebug, "Rebuilding container class cache: %u-%s%s", key.userId,
+                    className(key.containerClass), suffix(key.transient));
+        const std::uint64_t serial = before ? before->serial : 0;
+        const std::uint64_t drops = drops_;
+        ClassCache built = TRY(readUnlocked(key, [&] { return readClassDirectory(key); }));
+        // What an operation has done to the class since is not in what was read, or not as it is.
+        const ClassCache* const now = knownCache(key);
+        if (drops != drops_ || (now ? now->serial : 0) != serial)
+            continue;
+        if (now)
+            for (const Entry& known : now->entries)
+                if (const auto again = built.entries.find(known);
+                    again != built.entries.end() && again->record->place().name() == known.record->place().name())
+                    store(built, known);
+        ClassCache& cache = caches_[key] = std::move(built);
+        noteChange(cache);
+        if (wanted == Wanted::whole && cache.hidesSome)
+            return posixError(ZOR_HERE, ENOKEY, "An encryption whose key is away hides containers of user %u, class %s",
+                              key.userId, className(key.containerClass));
+        return &cache;
+    }
+    return posixError(ZOR_HERE, EAGAIN, "The containers of user %u, class %s, changed whenever they were read",
+                      key.userId, className(key.containerClass));
 }
 
-Result<ZORContainerCache::ClassCache*> ZORContainerCache::wholeCache(const Key& key) {
-    ClassCache* cache = TRY(_getCacheForUserId(key));
-    if (!cache->hidesSome)
-        return cache;
-    ClassCache built = TRY(readClassDirectory(key));
-    for (const Entry& known : cache->entries)
-        if (const auto again = built.entries.find(known);
-            again != built.entries.end() && again->record->place().name() == known.record->place().name())
-            store(built, known);
-    *cache = std::move(built);
-    if (cache->hidesSome)
-        return posixError(ZOR_HERE, ENOKEY, "An encryption whose key is away hides containers of user %u, class %s",
-                          key.userId, className(key.containerClass));
-    return cache;
+void ZORContainerCache::prepare(std::uint32_t userId, ContainerClass containerClass, bool transient) {
+    if (!isValidClass(containerClass) || !configuration_.users().mayOwn(containerClass, userId))
+        return;
+    (void)boundary_.run(ZOR_HERE, [&]() -> Result<void> {
+        const Key key{userId, containerClass, transient};
+        if (UserHome* const home = homeOf(key))
+            (void)home->lookIfDue();
+        const MutexLock held(cacheLock_);
+        (void)_getCacheForUserId(key);
+        return {};
+    });
+}
+
+void ZORContainerCache::prepare(std::uint32_t userId, ContainerClass containerClass) {
+    prepare(userId, containerClass, false);
+    if (isValidClass(containerClass) && lookForDirectory({userId, containerClass, true}) == 0)
+        prepare(userId, containerClass, true);
+}
+
+int ZORContainerCache::lookForDirectory(const Key& key) {
+    const auto place = configuration_.placeOfClass(key.userId, key.containerClass, key.transient);
+    const auto directory = place ? fileManager_.resolver().openDirectory(*place) : std::unexpected(ENOENT);
+    return directory ? 0 : directory.error();
 }
 
 Result<ZORContainerCache::ClassCache> ZORContainerCache::readClassDirectory(const Key& key) {
@@ -157,7 +222,7 @@ Result<ZORContainerCache::Found> ZORContainerCache::findRecord(const Key& key, c
         return failedToRebuild(here, key, cache.error());
     auto found = (*cache)->entries.find(std::string_view(identifier));
     if (found == (*cache)->entries.end() && (*cache)->hidesSome) {
-        cache = wholeCache(key);
+        cache = _getCacheForUserId(key, Wanted::whole);
         if (!cache)
             return failedToRebuild(here, key, cache.error());
         found = (*cache)->entries.find(std::string_view(identifier));
@@ -179,42 +244,51 @@ int ZORContainerCache::lookForFile(const FileURL& container) {
 }
 
 bool ZORContainerCache::lookOver(const Key& key, const Found& gone) {
+    const auto directory = configuration_.containerDirectoryURLForUser(key.userId, key.containerClass, key.transient);
     const MutexLock held(cacheLock_);
-    const auto cache = caches_.find(key);
-    if (cache == caches_.end())
-        return true; // somebody has been here meanwhile
-    auto& entries = cache->second.entries;
-    const auto known = entries.find(std::string_view(gone.record->identifier()));
-    if (known == entries.end() || known->record->place().name() != gone.place.name())
-        return true;
+    const auto stillLies = [&](const ClassCache& cache) {
+        const auto known = cache.entries.find(std::string_view(gone.record->identifier()));
+        return known != cache.entries.end() && known->record->place().name() == gone.place.name();
+    };
+    const auto before = caches_.find(key);
+    if (before == caches_.end() || beingRead_.contains(key) || !stillLies(before->second))
+        return true; // somebody has been here meanwhile, or is
     using Clock = std::chrono::steady_clock;
     const auto begin = Clock::now();
-    auto& next = nextLookOver_[key];
-    const auto directory = configuration_.containerDirectoryURLForUser(key.userId, key.containerClass, key.transient);
-    if (begin < next || !directory)
+    if (begin < nextLookOver_[key] || !directory)
         return false;
-    const platform::BlockingScope blocking;
+    const std::uint64_t serial = before->second.serial;
     std::set<std::string> names;
     ClassCache there;
-    const auto read = ClassDirectoryReader(log_, fileManager_, *directory, key.userId).forEach([&](Record record) {
-        names.insert(record->place().name());
-        record->setTransient(key.transient);
-        store(there, entryOf(std::move(record)));
+    const auto read = readUnlocked(key, [&] {
+        return ClassDirectoryReader(log_, fileManager_, *directory, key.userId).forEach([&](Record record) {
+            names.insert(record->place().name());
+            record->setTransient(key.transient);
+            store(there, entryOf(std::move(record)));
+        });
     });
     const auto end = Clock::now();
-    next = end + std::max<Clock::duration>(lookOverPauseMin, (end - begin) * lookOverShare);
+    nextLookOver_[key] = end + std::max<Clock::duration>(lookOverPauseMin, (end - begin) * lookOverShare);
     if (!read)
         return false;
-    // Only of what has gone from its place: others may be in the hands of an operation.
+    const auto now = caches_.find(key);
+    if (now == caches_.end())
+        return true;
+    // Only of what has gone from its place: others may be in the hands of an operation. When there has been one, the
+    // place of the one that was looked for is all that is known to be the same.
+    const bool unchanged = now->second.serial == serial;
     for (const Entry& entry : there.entries) {
-        const auto cached = entries.find(std::string_view(entry.record->identifier()));
-        if (cached == entries.end() || names.contains(cached->record->place().name()))
+        const auto cached = now->second.entries.find(std::string_view(entry.record->identifier()));
+        if (cached == now->second.entries.end() || names.contains(cached->record->place().name()))
+            continue;
+        if (!unchanged && (cached->record->identifier() != gone.record->identifier() || !stillLies(now->second)))
             continue;
         log_.write(logLevelNotice, __func__, "Cache: %s%s: Identifier: %s was moved from %s to %s",
                    className(key.containerClass), suffix(key.transient), ZOR_SHOWN(entry.record->identifier()),
                    cached->record->url().c_str(), entry.record->url().c_str());
-        store(cache->second, entry);
+        store(now->second, entry);
     }
+    noteChange(now->second);
     return true;
 }
 
@@ -335,7 +409,7 @@ Result<std::vector<ZORContainerCache::Record>> ZORContainerCache::listed(const K
             std::uint64_t homeGeneration = 0;
             {
                 const MutexLock held(cacheLock_);
-                const auto cache = wholeCache(key);
+                const auto cache = _getCacheForUserId(key, Wanted::whole);
                 if (!cache)
                     return failedToRebuild(here, key, cache.error());
                 homeGeneration = (*cache)->homeGeneration;
@@ -405,20 +479,29 @@ bool ZORContainerCache::buildAllOfUser(std::uint32_t userId) {
             const Key key{userId, static_cast<ContainerClass>(number), transient};
             if (!configuration_.users().mayOwn(key.containerClass, userId))
                 continue;
-            // A directory that is missing is not made for this, and what cannot be read holds nothing in memory either.
-            const auto place = configuration_.placeOfClass(userId, key.containerClass, transient);
-            const auto directory = place ? fileManager_.resolver().openDirectory(*place) : std::unexpected(ENOENT);
-            if (directory)
+            // What cannot be read holds nothing in memory either.
+            const int failure = lookForDirectory(key);
+            if (failure == 0) {
+                const MutexLock held(cacheLock_);
                 (void)_getCacheForUserId(key);
-            shortage = shortage || (!directory && isOwnShortage(directory.error()));
+            }
+            shortage = shortage || isOwnShortage(failure);
         }
     UserHome* const home = configuration_.homeOf(userId);
     return !shortage && (!home || home->lookIfDue().state != UserHome::State::missing);
 }
 
 ZORContainerCache::Held ZORContainerCache::heldByUser(std::uint32_t userId) {
+    std::uint64_t drops = 0;
+    bool isWhole = false;
+    {
+        const MutexLock held(cacheLock_);
+        isWhole = wholeUsers_.contains(userId);
+        drops = drops_;
+    }
+    const bool isBuilt = !isWhole && buildAllOfUser(userId);
     const MutexLock held(cacheLock_);
-    if (!wholeUsers_.contains(userId) && buildAllOfUser(userId))
+    if (isBuilt && drops == drops_)
         wholeUsers_.insert(userId);
     Held all;
     for (auto cache = caches_.lower_bound(Key{userId, ContainerClass::undefined, false});
@@ -448,6 +531,7 @@ Result<void> ZORContainerCache::addContainerMetadata(const Record& record, std::
                 return failedToRebuild(here, key, cache.error());
             record->setPlace(std::move(place));
             store(**cache, std::move(entry));
+            noteChange(**cache);
         }
         traceIdentifier(here, key, "Added", record->identifier());
         return {};
@@ -471,6 +555,7 @@ Result<void> ZORContainerCache::removeContainerForUser(std::uint32_t userId, Con
             if (!cache)
                 return failedToRebuild(here, key, cache.error());
             remove(**cache, *identifier);
+            noteChange(**cache);
         }
         traceIdentifier(here, key, "Removed", *identifier);
         return {};
@@ -481,6 +566,7 @@ void ZORContainerCache::dropAll() {
     const MutexLock held(cacheLock_);
     caches_.clear();
     wholeUsers_.clear();
+    ++drops_;
 }
 
 ZORContainerCache::Counts ZORContainerCache::counts() {

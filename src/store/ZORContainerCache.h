@@ -9,9 +9,10 @@
 // looked over once for where the container may have been moved to. Code 21 is the one answer that means "does not
 // exist"; every other failure means "not known".
 //
-// One mutex guards the class caches and is held while one is built; the checks on disk run after it is released. Who
-// needs a lookup and a later add to be one step holds the identifier locks around both. Exceptions end at these
-// operations (code 40).
+// One mutex guards the class caches. Nobody waits for a disk on it: a class directory is read without it, by one thread
+// for all that need it, and what was read counts unless the class has changed meanwhile. The checks on disk run without
+// it, too. Who needs a lookup and a later add to be one step holds the identifier locks around both, and has the class
+// read before it takes them (prepare). Exceptions end at these operations (code 40).
 #pragma once
 
 #include "base/ContainerClass.h"
@@ -86,6 +87,11 @@ public:
     Result<void> removeContainerForUser(std::uint32_t userId, ContainerClass containerClass,
                                         const std::string* identifier, bool transient);
 
+    /// Reads what a lookup will need, where that has not been done. For who takes the all-identifiers lock next, so
+    /// that nobody waits there for this disk. What fails is told by the lookup.
+    void prepare(std::uint32_t userId, ContainerClass containerClass, bool transient) ZOR_EXCLUDES(cacheLock_);
+    /// The same for a lookup by UUID: of transient containers only where there may be some.
+    void prepare(std::uint32_t userId, ContainerClass containerClass) ZOR_EXCLUDES(cacheLock_);
     /// Forgets every class cache; each is built anew when it is next needed.
     void dropAll() ZOR_EXCLUDES(cacheLock_);
     /// The containers of a user, in classes of every kind, transient ones included. The first time that a user is asked
@@ -125,6 +131,8 @@ private:
         std::uint64_t homeGeneration = 0;
         /// There may be others, which an encryption hid when the directory was read.
         bool hidesSome = false;
+        /// Another one after each change of the entries.
+        std::uint64_t serial = 0;
     };
     struct Key {
         std::uint32_t userId;
@@ -133,13 +141,21 @@ private:
         auto operator<=>(const Key&) const = default;
     };
 
-    Result<ClassCache*> _getCacheForUserId(const Key& key) ZOR_REQUIRES(cacheLock_);
+    /// `whole` is for who is about to say that something is not there: the directory is read again when some of it was
+    /// hidden, and while that is so it is an error. The records that are known stay the same objects.
+    enum class Wanted { asKnown, whole };
+    /// Reads what is missing for that. Returns with the class cache there, or an error.
+    Result<ClassCache*> _getCacheForUserId(const Key& key, Wanted wanted = Wanted::asKnown) ZOR_REQUIRES(cacheLock_);
+    /// The class cache as it is; nullptr when there is none, or none of the home that is there.
+    ClassCache* knownCache(const Key& key) ZOR_REQUIRES(cacheLock_);
+    /// Lets the mutex go while it runs `read`; other readers of the class wait meanwhile.
+    template <typename Read>
+    auto readUnlocked(const Key& key, Read&& read) ZOR_REQUIRES(cacheLock_);
     Result<ClassCache> readClassDirectory(const Key& key);
-    /// For who is about to say that something is not there: reads the directory again when some of it was hidden, and
-    /// fails while that is so. The records that are known stay the same objects.
-    Result<ClassCache*> wholeCache(const Key& key) ZOR_REQUIRES(cacheLock_);
+    /// 0, or the errno for which the class has no directory now. One that is missing is not made for this.
+    int lookForDirectory(const Key& key);
     /// False when want of descriptors or memory left one unbuilt.
-    bool buildAllOfUser(std::uint32_t userId) ZOR_REQUIRES(cacheLock_);
+    bool buildAllOfUser(std::uint32_t userId) ZOR_EXCLUDES(cacheLock_);
     /// A record and where it lay when the cache was looked at. Another operation may move the container meanwhile; who
     /// holds the lock of this very container sees both agree.
     struct Found {
@@ -172,6 +188,7 @@ private:
     static Entry entryOf(Record record);
     static void store(ClassCache& cache, Entry entry);
     static void remove(ClassCache& cache, std::string_view identifier);
+    void noteChange(ClassCache& cache) ZOR_REQUIRES(cacheLock_) { cache.serial = ++serials_; }
     /// A level-7 line under the operation's own name, which a lambda inside it does not have.
     void traceIdentifier(Here here, const Key& key, const char* what, const std::string& identifier);
 
@@ -181,6 +198,12 @@ private:
     fs::Durability& durability_;
     ExceptionBoundary& boundary_;
     platform::Mutex cacheLock_;
+    platform::ConditionVariable readEnded_;
+    /// Classes whose directories are being read.
+    std::set<Key> beingRead_ ZOR_GUARDED_BY(cacheLock_);
+    std::uint64_t serials_ ZOR_GUARDED_BY(cacheLock_) = 0;
+    /// How often all were dropped.
+    std::uint64_t drops_ ZOR_GUARDED_BY(cacheLock_) = 0;
     std::map<Key, ClassCache> caches_ ZOR_GUARDED_BY(cacheLock_);
     /// Users of whom every class cache has been built that could be.
     std::set<std::uint32_t> wholeUsers_ ZOR_GUARDED_BY(cacheLock_);

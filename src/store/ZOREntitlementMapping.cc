@@ -401,6 +401,15 @@ bool ZOREntitlementMapping::callerRegistrationIsDue(const std::string& identifie
     return !_onQueue_changesNothing(&entitlements, identifier, &options);
 }
 
+bool ZOREntitlementMapping::mayHaveGroups(std::string_view identifier, GroupType type) {
+    const MutexLock held(entitlementQueue_);
+    const plist::Dictionary* const entitlements = entitlementsOf(identifier);
+    const auto has = [&](std::string_view key) { return entitlements && entitlements->find(key); };
+    return type == GroupType::application
+               ? has(entitlementKeys::applicationGroups)
+               : has(entitlementKeys::systemGroups) || has(entitlementKeys::systemGroupContainers);
+}
+
 GroupReferences ZOREntitlementMapping::groupReferences(GroupType type) {
     const MutexLock held(entitlementQueue_);
     return groupReferencesIn(entitlementMappingDict_, type, &log_);

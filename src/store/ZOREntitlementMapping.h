@@ -55,6 +55,8 @@ public:
     /// Without those that do not begin with "systemgroup.".
     [[nodiscard]] Identifiers systemGroupIdentifiersForIdentifier(std::string_view identifier)
         ZOR_EXCLUDES(entitlementQueue_);
+    /// Whether anything is stored about groups of the type, whatever it is.
+    [[nodiscard]] bool mayHaveGroups(std::string_view identifier, GroupType type) ZOR_EXCLUDES(entitlementQueue_);
     /// The identifiers that refer to each group.
     [[nodiscard]] GroupReferences groupReferences(GroupType type) ZOR_EXCLUDES(entitlementQueue_);
     /// The children recorded for an identifier.

@@ -48,14 +48,18 @@ void ZORGlobalConfiguration::makeDirectory(const FileURL& url, const DirectoryAt
 }
 
 ZORPerUserConfiguration* ZORGlobalConfiguration::getPerUserConfigurationForUserId(std::uint32_t userId) {
-    const RecursiveMutexLock held(lock_);
-    const auto known = perUserConfigurations_.find(userId);
-    if (known != perUserConfigurations_.end())
-        return known->second.get();
+    {
+        const RecursiveMutexLock held(lock_);
+        const auto known = perUserConfigurations_.find(userId);
+        if (known != perUserConfigurations_.end())
+            return known->second.get();
+    }
+    // The password database and the home may be slow; nobody else waits for them.
     auto made = ZORPerUserConfiguration::initWithUserId(userId, log_, fileManager_, homeOf(userId));
     if (!made)
         return nullptr;
-    return perUserConfigurations_.emplace(userId, std::move(made)).first->second.get();
+    const RecursiveMutexLock held(lock_);
+    return perUserConfigurations_.try_emplace(userId, std::move(made)).first->second.get();
 }
 
 void ZORGlobalConfiguration::fenceHomes() {
@@ -241,7 +245,6 @@ std::optional<FileURL> ZORGlobalConfiguration::placeOfClass(std::uint32_t userId
                                                             bool transient) {
     std::optional<FileURL> home;
     if (isPerUserClass(containerClass)) {
-        const RecursiveMutexLock held(lock_);
         ZORPerUserConfiguration* user = getPerUserConfigurationForUserId(userId);
         home = user ? user->userHomeDirectory() : std::nullopt;
     }

@@ -5,7 +5,7 @@
 // when that fails and returns the place anyway. Whether a user may own a class is its callers' question.
 //
 // One recursive lock is held for a whole getter, directory creation included, unless the directory is a mobile user's:
-// then only that user's own.
+// then only that user's own. The password database and a user's home are asked without it.
 #pragma once
 
 #include "base/ContainerClass.h"

@@ -6,6 +6,7 @@
 
 #include <atomic>
 #include <filesystem>
+#include <future>
 #include <gtest/gtest.h>
 #include <sys/wait.h>
 #include <thread>
@@ -188,8 +189,7 @@ TEST(Syncs, AreWaitedForWithoutTheLock) {
                                         world.make(id, ContainerClass::dataSystem).path};
             for (const ContainerClass containerClass : {ContainerClass::bundleApplication, application})
                 (void)world.make(id, containerClass);
-            for (const std::uint32_t user : {mobile, second})
-                (void)world.services().cache().containerForUser(user, ContainerClass::sharedAppGroup, &id, false);
+            world.services().cache().dropAll(); // as after a start: class directories are read, and synced
             int syncs = 0;
             int held = 0;
             world.disk().before = [&, mine = std::this_thread::get_id()](const support::DiskCallInfo& call) {
@@ -208,6 +208,51 @@ TEST(Syncs, AreWaitedForWithoutTheLock) {
             for (const std::string& path : gone)
                 EXPECT_EQ(isThere(path), !releases);
         }
+}
+
+// Goal: a class directory that is slow keeps nobody else, and what was read counts only as far as nothing has changed.
+// Method: while one is read for the first time, and while one is looked over, what others do.
+TEST_F(Known, ASlowDirectoryKeepsNobodyElse) {
+    const FoundContainer mine = world.make("mine");
+    const FoundContainer slow = world.create("slow", application, false, second).value();
+    ZORContainerCache& cache = world.services().cache();
+    const auto whileReading = [&](const std::function<void()>& others, const std::function<void()>& read) {
+        std::atomic<bool> entered{false};
+        world.disk().unreadable = [&](int) {
+            if (!entered.exchange(true)) {
+                auto done = std::async(std::launch::async, others);
+                EXPECT_EQ(done.wait_for(std::chrono::seconds(20)), std::future_status::ready);
+            }
+            return 0;
+        };
+        read();
+        world.disk().unreadable = nullptr;
+        EXPECT_TRUE(entered);
+    };
+    cache.dropAll();
+    whileReading(
+        [&] {
+            EXPECT_EQ(world.make("mine").uuid, mine.uuid);
+            EXPECT_TRUE(world.create("another"));
+            EXPECT_EQ(cache.counts().classCaches, 1U);
+        },
+        [&] { EXPECT_EQ(world.create("slow", application, false, second).value().uuid, slow.uuid); });
+    EXPECT_EQ(cache.heldByUser(second).containers, 1U);
+    // Its owner has moved it; a deletion and a creation beside it come to pass meanwhile.
+    const FoundContainer another = world.make("another");
+    ASSERT_EQ(::rename(mine.path.c_str(), (parentOf(mine.path) + "/" + UUID::random().string()).c_str()), 0);
+    whileReading(
+        [&] {
+            EXPECT_TRUE(world.services().store().removal.stage(
+                {.userId = mobile, .uuid = another.uuid, .identifier = "another", .containerClass = application}));
+            EXPECT_TRUE(world.create("newest"));
+        },
+        [&] {
+            EXPECT_EQ(cache.containerForUser(mobile, application, &mine.record->identifier(), false).value()->uuid(),
+                      mine.uuid);
+        });
+    EXPECT_EQ(codeOf(world.find("another")), ErrorCode::notFound);
+    EXPECT_TRUE(world.make("newest").existed);
 }
 
 // Goal: operations on one container, and registrations beside them, may run together. Method: a thread for each while
