@@ -284,6 +284,23 @@ TEST(WantOfDescriptors, TheRegistryHoldsWhatItHeld) {
     }
 }
 
+// Goal: a registry that got no notices of changes when it was made asks for them again. Method: one made without a
+// descriptor; a change after its first look is found at once by who asks for notices alone.
+TEST(WantOfDescriptors, TheRegistryAsksForNoticesAgain) {
+    PeerWorld world;
+    std::optional<IdentityRegistry> registry;
+    {
+        const support::FewDescriptors few(0);
+        registry.emplace(world.test.root(), world.log, ::geteuid());
+    }
+    ::usleep(30'000); // a look that was a moment ago is not repeated
+    registry->takeNotices();
+    EXPECT_TRUE(registry->snapshot()->entries.empty());
+    world.registerAs("a.plist", "agent", "agent");
+    registry->takeNotices();
+    EXPECT_EQ(registry->snapshot()->entries.size(), 1U);
+}
+
 // Goal: a peer that cannot be pinned is refused, for it would be nobody as long as it is connected; one of which an
 // entry's condition cannot be looked up is granted nothing, not what a later entry grants. Method: a process is looked
 // at, and the kernel's agent accepted, with too few descriptors.

@@ -11,12 +11,14 @@
 #include <csignal>
 #include <cstring>
 #include <filesystem>
+#include <fstream>
 #include <future>
 #include <gtest/gtest.h>
 #include <poll.h>
 #include <sched.h>
 #include <set>
 #include <sstream>
+#include <sys/mount.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/syscall.h>
@@ -399,6 +401,31 @@ TEST(Life, KilledWhileAChangeOfProtectionWaits) {
     expectCall(daemon, {show, 0, "\"recorded\": 3"});
     expectCall(daemon, {{"protect", "a.b", "1", "--class", "2", "--third-party"}, 0, "has class 1"});
     expectCall(daemon, {show, 0, "\"recorded\": 1"});
+}
+
+// Goal: what the daemon shows and a full disk did not take is found, until it is saved. Method: a small file system.
+TEST(Tool, FindsInfoThatIsNotSaved) {
+    const support::TemporaryDirectory disk("/dev/shm");
+    if (::mount("small", disk.path().c_str(), "tmpfs", 0, "mode=0755,size=1m") != 0)
+        GTEST_SKIP() << "needs root: a file system of its own";
+    {
+        DaemonProcess daemon(DaemonProcess::Syncs::off, disk.path());
+        daemon.start();
+        zorvane::Client client = daemon.client();
+        const auto made = client.createOrLookup(dataContainer("a")).value();
+        const auto set = [&] { return client.setInfoValue({dataApplication, mobile, "a", made.uuid}, "k", {{true}}); };
+        std::ofstream filler(disk.path() + "/filler");
+        while (filler << 'x' << std::flush) {
+        }
+        const auto refused = set();
+        EXPECT_TRUE(!refused && refused.error().code == 34);
+        expectCall(daemon, {{"--json", "check"}, 4, "info-unsaved"});
+        filler.close();
+        std::filesystem::remove(disk.path() + "/filler");
+        EXPECT_TRUE(set());
+        expectCall(daemon, {{"--json", "check"}, 0, "\"findings\": []"});
+    }
+    ::umount2(disk.path().c_str(), MNT_DETACH);
 }
 
 // Goal: damage is found, told and mended as promised, with a daemon and without one. Method: a table of calls over a
