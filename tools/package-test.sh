@@ -96,6 +96,10 @@ list="$(find "$root/home/ann/Containers" -name list)"
 [[ "$(<"$list")" == milk ]] || fail "the program's file is not in its container"
 [[ "$(inside 'stat -c %U /private/var/brevad')" == zorvane-installer ]] || fail "transient bundles belong to somebody else"
 
+say "The library and its Python module"
+inside 'python3 -c "import zorvane; print(zorvane.Client().status()[\"Peer\"])"' ||
+    fail "a program of others does not reach the daemon"
+
 say "Every kind of work, under the unit's fences"
 inside 'set -e; ctl() { zorvanectl "$@" >/dev/null || { echo "zorvanectl $*" >&2; exit 1; }; }
     app=(org.example.notes --class data-app --user 1000)

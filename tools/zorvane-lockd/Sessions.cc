@@ -1,0 +1,176 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "Sessions.h"
+
+#include <algorithm>
+#include <memory>
+#include <optional>
+
+namespace zorvanelockd {
+
+namespace {
+
+constexpr const char* service = "org.freedesktop.login1";
+constexpr const char* managerPath = "/org/freedesktop/login1";
+constexpr const char* managerInterface = "org.freedesktop.login1.Manager";
+constexpr const char* sessionInterface = "org.freedesktop.login1.Session";
+constexpr const char* properties = "org.freedesktop.DBus.Properties";
+constexpr const char* busName = "org.freedesktop.DBus";
+
+struct Unref {
+    void operator()(sd_bus_message* message) const { sd_bus_message_unref(message); }
+};
+using Message = std::unique_ptr<sd_bus_message, Unref>;
+
+/// A property of a session; nullptr where it cannot be had, as of one that has just ended.
+Message property(sd_bus* bus, const std::string& path, const char* name, const char* type) {
+    sd_bus_message* reply = nullptr;
+    (void)sd_bus_get_property(bus, service, path.c_str(), sessionInterface, name, nullptr, &reply, type);
+    return Message(reply);
+}
+
+bool isUsers(sd_bus* bus, const std::string& path) {
+    const Message reply = property(bus, path, "Class", "s");
+    const char* kind = nullptr;
+    return reply && sd_bus_message_read(reply.get(), "s", &kind) > 0 && std::string_view(kind) == "user";
+}
+
+bool hasSeat(sd_bus* bus, const std::string& path) {
+    const Message reply = property(bus, path, "Seat", "(so)");
+    const char* seat = nullptr;
+    const char* seatPath = nullptr;
+    return reply && sd_bus_message_read(reply.get(), "(so)", &seat, &seatPath) > 0 && *seat != '\0';
+}
+
+std::optional<bool> lockedHint(sd_bus* bus, const std::string& path) {
+    const Message reply = property(bus, path, "LockedHint", "b");
+    int hint = 0;
+    return reply && sd_bus_message_read(reply.get(), "b", &hint) > 0 ? std::optional(hint != 0) : std::nullopt;
+}
+
+} // namespace
+
+template <int (Sessions::*handle)(sd_bus_message*)>
+int Sessions::handler(sd_bus_message* message, void* sessions, sd_bus_error*) {
+    return (static_cast<Sessions*>(sessions)->*handle)(message);
+}
+
+int Sessions::follow() {
+    const struct {
+        const char* sender;
+        const char* path;
+        const char* interface;
+        const char* member;
+        sd_bus_message_handler_t handle;
+    } matches[] = {
+        {service, managerPath, managerInterface, "SessionNew", handler<&Sessions::added>},
+        {service, managerPath, managerInterface, "SessionRemoved", handler<&Sessions::removed>},
+        {service, nullptr, sessionInterface, "Lock", handler<&Sessions::lockSaid>},
+        {service, nullptr, sessionInterface, "Unlock", handler<&Sessions::lockSaid>},
+        {service, nullptr, properties, "PropertiesChanged", handler<&Sessions::propertiesChanged>},
+        {busName, "/org/freedesktop/DBus", busName, "NameOwnerChanged", handler<&Sessions::ownerChanged>},
+    };
+    for (const auto& match : matches)
+        if (const int failure = sd_bus_match_signal(bus_, nullptr, match.sender, match.path, match.interface,
+                                                    match.member, match.handle, this);
+            failure < 0)
+            return failure;
+    begin();
+    return 0;
+}
+
+void Sessions::begin() {
+    locked_.clear();
+    owner_.clear();
+    sd_bus_message* reply = nullptr;
+    const char* owner = nullptr;
+    if (sd_bus_call_method(bus_, busName, "/org/freedesktop/DBus", busName, "GetNameOwner", nullptr, &reply, "s",
+                           service) >= 0 &&
+        sd_bus_message_read(reply, "s", &owner) > 0)
+        owner_ = owner;
+    sd_bus_message_unref(reply);
+    reply = nullptr;
+    if (!owner_.empty() && sd_bus_call_method(bus_, service, managerPath, managerInterface, "ListSessions", nullptr,
+                                              &reply, nullptr) >= 0) {
+        const char* path = nullptr;
+        (void)sd_bus_message_enter_container(reply, 'a', "(susso)");
+        while (sd_bus_message_read(reply, "(susso)", nullptr, nullptr, nullptr, nullptr, &path) > 0)
+            add(path);
+    }
+    sd_bus_message_unref(reply);
+    tell();
+}
+
+void Sessions::add(const std::string& path) {
+    if (!isUsers(bus_, path) || !hasSeat(bus_, path))
+        return;
+    if (const auto hint = lockedHint(bus_, path))
+        locked_[path] = *hint;
+}
+
+void Sessions::tell() {
+    changed_(!locked_.empty() && std::ranges::all_of(locked_, [](const auto& session) { return session.second; }));
+}
+
+bool Sessions::isServices(sd_bus_message* message) const {
+    const char* const sender = sd_bus_message_get_sender(message);
+    return sender && !owner_.empty() && owner_ == sender;
+}
+
+int Sessions::added(sd_bus_message* message) {
+    const char* path = nullptr;
+    if (isServices(message) && sd_bus_message_read(message, "so", nullptr, &path) > 0)
+        add(path);
+    tell();
+    return 0;
+}
+
+int Sessions::removed(sd_bus_message* message) {
+    const char* path = nullptr;
+    if (isServices(message) && sd_bus_message_read(message, "so", nullptr, &path) > 0)
+        locked_.erase(path);
+    tell();
+    return 0;
+}
+
+int Sessions::lockSaid(sd_bus_message* message) {
+    const auto session = locked_.find(sd_bus_message_get_path(message));
+    if (isServices(message) && session != locked_.end())
+        session->second = std::string_view(sd_bus_message_get_member(message)) == "Lock";
+    tell();
+    return 0;
+}
+
+int Sessions::propertiesChanged(sd_bus_message* message) {
+    const std::string path = sd_bus_message_get_path(message);
+    const auto session = locked_.find(path);
+    if (!isServices(message) || session == locked_.end())
+        return 0;
+    // Other properties change often, and say nothing of a lock that was only signalled.
+    const char* interface = nullptr;
+    const char* name = nullptr;
+    if (sd_bus_message_read(message, "s", &interface) <= 0 || std::string_view(interface) != sessionInterface ||
+        sd_bus_message_enter_container(message, 'a', "{sv}") <= 0)
+        return 0;
+    while (sd_bus_message_enter_container(message, 'e', "sv") > 0) {
+        int hint = 0;
+        if (sd_bus_message_read(message, "s", &name) > 0 && std::string_view(name) == "LockedHint" &&
+            sd_bus_message_read(message, "v", "b", &hint) > 0)
+            session->second = hint != 0;
+        else
+            (void)sd_bus_message_skip(message, "v");
+        (void)sd_bus_message_exit_container(message);
+    }
+    tell();
+    return 0;
+}
+
+int Sessions::ownerChanged(sd_bus_message* message) {
+    const char* const sender = sd_bus_message_get_sender(message);
+    const char* name = nullptr;
+    if (sender && std::string_view(sender) == busName && sd_bus_message_read(message, "s", &name) > 0 &&
+        std::string_view(name) == service)
+        begin();
+    return 0;
+}
+
+} // namespace zorvanelockd

@@ -1,0 +1,50 @@
+// SPDX-License-Identifier: Apache-2.0
+// The sessions at the device's seats, and whether all of them are locked, as the login service (logind) says.
+//
+// A session counts when it is a user's and has a seat: a remote one cannot be locked, and would hold the device open.
+// It is locked by the service's Lock signal and by its LockedHint, which the desktop sets, and unlocked by Unlock and
+// by the hint going; whichever is heard last counts. Anybody may send a signal to this connection, so one counts only
+// when it comes from the connection that owns the service's name. One thread: that of the bus.
+#pragma once
+
+#include <functional>
+#include <map>
+#include <string>
+#include <systemd/sd-bus.h>
+
+namespace zorvanelockd {
+
+class Sessions {
+public:
+    /// `changed` is told the state after each event that may have changed it, and at the beginning.
+    using Changed = std::function<void(bool isLocked)>;
+    Sessions(sd_bus* bus, Changed changed) : bus_(bus), changed_(std::move(changed)) {}
+    Sessions(const Sessions&) = delete;
+    Sessions& operator=(const Sessions&) = delete;
+    /// Once, before the bus is processed. 0, or a negative errno.
+    int follow();
+
+private:
+    template <int (Sessions::*handle)(sd_bus_message*)>
+    static int handler(sd_bus_message* message, void* sessions, sd_bus_error*);
+    int added(sd_bus_message* message);
+    int removed(sd_bus_message* message);
+    int lockSaid(sd_bus_message* message);
+    int propertiesChanged(sd_bus_message* message);
+    int ownerChanged(sd_bus_message* message);
+
+    /// Asks the service for all that there is.
+    void begin();
+    void add(const std::string& path);
+    void tell();
+    [[nodiscard]] bool isServices(sd_bus_message* message) const;
+
+    sd_bus* const bus_;
+    const Changed changed_;
+    /// The connection that owns the service's name; empty while nobody does.
+    std::string owner_;
+    /// Object path to whether the session is locked.
+    std::map<std::string, bool> locked_;
+};
+
+} // namespace zorvanelockd
