@@ -140,24 +140,21 @@ Scenario release() {
 
 Scenario firstUseOfGroups() {
     const std::vector<Request> requests = {{"group.a", ContainerClass::sharedAppGroup, mobileUser},
-                                           {"group.b", ContainerClass::sharedAppGroup, mobileUser},
                                            {"systemgroup.a", ContainerClass::sharedSystemGroup, systemUser}};
-    return {
-        .name = "first use of groups",
-        .prepare =
-            [](Device& device) { mustRegister(device, app, entitlements({"group.a", "group.b"}, {"systemgroup.a"})); },
-        .act =
-            [requests](Device& device) {
-                Composition& composition = device.daemon->world.services();
-                for (const Request& request : requests) {
-                    const auto paths = composition.groups().groupContainerPathsForUser(
-                        request.userId, composition.sharedClientConnection()->caller(), &app);
-                    if (!paths || !paths->contains(request.identifier))
-                        continue;
-                    device.promise(request, paths->at(request.identifier));
-                }
-            },
-        .requests = requests};
+    return {.name = "first use of groups",
+            .prepare = [](Device& device) { mustRegister(device, app, entitlements({"group.a"}, {"systemgroup.a"})); },
+            .act =
+                [requests](Device& device) {
+                    Composition& composition = device.daemon->world.services();
+                    for (const Request& request : requests) {
+                        const auto paths = composition.groups().groupContainerPathsForUser(
+                            request.userId, composition.sharedClientConnection()->caller(), &app);
+                        if (!paths || !paths->contains(request.identifier))
+                            continue;
+                        device.promise(request, paths->at(request.identifier));
+                    }
+                },
+            .requests = requests};
 }
 
 } // namespace

@@ -8,12 +8,11 @@
 
 #include <algorithm>
 #include <atomic>
-#include <condition_variable>
 #include <csignal>
 #include <fcntl.h>
 #include <filesystem>
+#include <future>
 #include <gtest/gtest.h>
-#include <mutex>
 #include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -28,26 +27,20 @@ const std::string key = "com.veltra.Brevance.ContentProtectionClass";
 const std::string identifier = "com.example.app";
 const std::string assertionFile = "run/zorvane/assertions/com.example.app";
 
-/// What a completion was told, in the order of the calls.
+/// What a completion was told; a second answer throws.
 class Answers {
 public:
     ZORDataProtectionManager::Completion completion() {
-        return [this](ErrorCode code) {
-            const std::lock_guard held(mutex_);
-            codes_.push_back(static_cast<std::uint64_t>(code));
-            told_.notify_all();
-        };
+        return [this](ErrorCode code) { told_.set_value(static_cast<std::uint64_t>(code)); };
     }
-    std::vector<std::uint64_t> codes(std::chrono::seconds wait = std::chrono::seconds(0)) {
-        std::unique_lock held(mutex_);
-        told_.wait_for(held, wait, [this] { return !codes_.empty(); });
-        return codes_;
+    [[nodiscard]] std::vector<std::uint64_t> codes(std::chrono::seconds wait = std::chrono::seconds(0)) const {
+        const bool isTold = answer_.wait_for(wait) == std::future_status::ready;
+        return isTold ? std::vector{answer_.get()} : std::vector<std::uint64_t>();
     }
 
 private:
-    std::mutex mutex_;
-    std::condition_variable told_;
-    std::vector<std::uint64_t> codes_;
+    std::promise<std::uint64_t> told_;
+    const std::shared_future<std::uint64_t> answer_ = told_.get_future().share();
 };
 
 class Protection : public testing::Test {
