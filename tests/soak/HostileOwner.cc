@@ -8,6 +8,7 @@
 #include <cstdio>
 #include <fcntl.h>
 #include <filesystem>
+#include <functional>
 #include <stdexcept>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -74,27 +75,24 @@ zorvane::Result<void> HostileOwner::askOnce(zorvane::Client& client) {
     if (!made)
         return std::unexpected(made.error());
     const zorvane::Client::Address address{dataApplication, hostileUser, identifier, made->uuid};
-    switch (asking_.upTo(7)) {
-    case 0:
-        return client.wipe(dataApplication, hostileUser, identifier);
-    case 1:
-        return client.recreateDefaultStructure(address);
-    case 2:
-        return client.regenerateDirectoryUUID(address);
-    case 3:
-        if (const auto size = client.diskUsage(address); !size)
-            return std::unexpected(size.error());
-        return {};
-    case 4:
-        return client.stageForDelete({address});
-    case 5:
-        return client.setInfoValue(address, "k", zorvane::Value{std::string("v")});
-    default:
-        return client.setDataProtection({.containerClass = dataApplication,
-                                         .user = hostileUser,
-                                         .identifier = identifier,
-                                         .protectionClass = asking_.oneIn(2) ? 1 : 3});
-    }
+    const std::function<zorvane::Result<void>()> requests[] = {
+        [&] { return client.wipe(dataApplication, hostileUser, identifier); },
+        [&] { return client.recreateDefaultStructure(address); },
+        [&] { return client.regenerateDirectoryUUID(address); },
+        [&] {
+            const auto size = client.diskUsage(address);
+            return size ? zorvane::Result<void>() : std::unexpected(size.error());
+        },
+        [&] { return client.stageForDelete({address}); },
+        [&] { return client.setInfoValue(address, "k", zorvane::Value{std::string("v")}); },
+        [&] {
+            return client.setDataProtection({.containerClass = dataApplication,
+                                             .user = hostileUser,
+                                             .identifier = identifier,
+                                             .protectionClass = asking_.oneIn(2) ? 1 : 3});
+        },
+    };
+    return requests[asking_.upTo(std::size(requests))]();
 }
 
 void HostileOwner::askByHalves() {

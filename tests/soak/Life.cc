@@ -5,6 +5,7 @@
 #include <array>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <set>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -254,52 +255,39 @@ private:
     }
 
     void actOnLive(Item& item, const Known& known) {
-        switch (choices_.upTo(10)) {
-        case 0:
-            if (answered(item, "delete",
-                         client_->deleteContainer(item.containerClass, item.user, item.identifier, false),
-                         std::nullopt))
+        const auto remove = [&](const char* how, const zorvane::Result<void>& gone) {
+            if (answered(item, how, gone, std::nullopt))
                 went(item);
-            break;
-        case 1:
-            if (answered(item, "stage", client_->stageForDelete({addressOf(item, known)}), std::nullopt))
-                went(item);
-            break;
-        case 2: {
-            const Known after{known.uuid, known.content, newText()};
-            const auto set = client_->setInfoValue(addressOf(item, known), valueKey, zorvane::Value{after.value});
-            if (answered(item, "set info", set, after))
-                item.model.become(after);
-            else if (set.error().kind == Error::Kind::daemon)
-                item.model.doubtValue();
-            break;
-        }
-        case 3: {
-            const Known after{known.uuid, "", ""};
-            if (item.containerClass == bundleApplication)
-                break;
-            if (answered(item, "wipe", client_->wipe(item.containerClass, item.user, item.identifier), after))
-                item.model.become(after);
-            break;
-        }
-        case 4:
-            (void)answered(item, "regenerate", client_->regenerateDirectoryUUID(addressOf(item, known)), known);
-            break;
-        case 5:
-            replace(item);
-            break;
-        case 6:
-            mendStructure(item, known);
-            break;
-        case 7:
-            protect(item);
-            break;
-        case 8:
-            question(item, known);
-            break;
-        default:
-            writeContent(item, known);
-        }
+        };
+        const std::function<void()> actions[] = {
+            [&] { remove("delete", client_->deleteContainer(item.containerClass, item.user, item.identifier, false)); },
+            [&] { remove("stage", client_->stageForDelete({addressOf(item, known)})); },
+            [&] { setValue(item, known); },
+            [&] {
+                const Known after{known.uuid, "", ""};
+                if (item.containerClass != bundleApplication &&
+                    answered(item, "wipe", client_->wipe(item.containerClass, item.user, item.identifier), after))
+                    item.model.become(after);
+            },
+            [&] {
+                (void)answered(item, "regenerate", client_->regenerateDirectoryUUID(addressOf(item, known)), known);
+            },
+            [&] { replace(item); },
+            [&] { mendStructure(item, known); },
+            [&] { protect(item); },
+            [&] { question(item, known); },
+            [&] { writeContent(item, known); },
+        };
+        actions[choices_.upTo(std::size(actions))]();
+    }
+
+    void setValue(Item& item, const Known& known) {
+        const Known after{known.uuid, known.content, newText()};
+        const auto set = client_->setInfoValue(addressOf(item, known), valueKey, zorvane::Value{after.value});
+        if (answered(item, "set info", set, after))
+            item.model.become(after);
+        else if (set.error().kind == Error::Kind::daemon)
+            item.model.doubtValue();
     }
 
     void went(Item& item) {

@@ -23,10 +23,6 @@ protected:
     World world;
 
     Names left() { return world.services().store().deathRow.left().paths; }
-
-    Result<void> condemn(std::string_view relative, StartDeletionThread start = StartDeletionThread::no) {
-        return world.daemonsClient()._moveItemAtURLToDeathRow(world.url(relative), start);
-    }
 };
 
 // Goal: a pass that takes the fresh unique directory for rubbish costs no item. Method: it goes before the move.
@@ -42,7 +38,7 @@ TEST_F(DeathRow, APassRacesAMove) {
             }
             return false;
         }});
-        const auto moved = condemn("item");
+        const auto moved = world.daemonsClient()._moveItemAtURLToDeathRow(world.url("item"), StartDeletionThread::no);
         world.disk().disarm();
         EXPECT_EQ(codeOf(moved), always ? ErrorCode::moveToDeathRowFailed : ErrorCode::success);
         EXPECT_EQ(world.exists("item"), always);

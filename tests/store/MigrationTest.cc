@@ -105,7 +105,7 @@ TEST(Migration, BundlesMoveOnce) {
         EXPECT_EQ(world.item(directory), directoryOf(33));
     EXPECT_EQ(world.read(moved + "/program"), "code");
     EXPECT_EQ(world.item(metadataIn(moved)), "file 0644 0:0");
-    EXPECT_EQ(world.readDictionary(bundleMarker).string("ZORMigrationTime")->size(), 25U);
+    EXPECT_NE(world.read(bundleMarker).find("ZORMigrationTime"), std::string::npos);
     putFormerBundle(world, former + "/Application/" + secondUuid, "com.example.b");
     world.restart();
     const auto again = migrateBundles(world);

@@ -29,11 +29,9 @@ public:
     /// `level` of a handle that is open from the start; 0 for none yet.
     explicit RecordingLog(int level = 0) : level_(level) {}
 
-    bool open(std::string_view name, int level) override {
-        const platform::MutexLock held(mutex_);
-        openedAs_ = name;
-        level_ = refusesToOpen_ ? 0 : level;
-        return level_ != 0;
+    bool open(std::string_view, int level) override {
+        setLevel(level);
+        return true;
     }
     [[nodiscard]] bool isOpen() const override {
         const platform::MutexLock held(mutex_);
@@ -43,10 +41,7 @@ public:
         const platform::MutexLock held(mutex_);
         return level_;
     }
-    void enableDiskLogging(const std::string& path, unsigned fileCount, std::size_t fileBytesMax) override {
-        const platform::MutexLock held(mutex_);
-        disk_ = path + " " + std::to_string(fileCount) + " " + std::to_string(fileBytesMax);
-    }
+    void enableDiskLogging(const std::string&, unsigned, std::size_t) override {}
     void write(int level, std::string_view function, std::string_view message) override {
         const platform::MutexLock held(mutex_);
         lines_.push_back({level, std::string(function), std::string(message)});
@@ -59,10 +54,6 @@ public:
     void setLevel(int level) {
         const platform::MutexLock held(mutex_);
         level_ = level;
-    }
-    void refuseToOpen() {
-        const platform::MutexLock held(mutex_);
-        refusesToOpen_ = true;
     }
     /// The lines since the last call.
     std::vector<LogLine> take() {
@@ -77,22 +68,10 @@ public:
                 messages.push_back(std::move(line.message));
         return messages;
     }
-    /// "NAME" and "PATH COUNT BYTES" as they were asked for.
-    [[nodiscard]] std::string openedAs() const {
-        const platform::MutexLock held(mutex_);
-        return openedAs_;
-    }
-    [[nodiscard]] std::string diskLogging() const {
-        const platform::MutexLock held(mutex_);
-        return disk_;
-    }
 
 private:
     mutable platform::Mutex mutex_;
     int level_ ZOR_GUARDED_BY(mutex_);
-    bool refusesToOpen_ ZOR_GUARDED_BY(mutex_) = false;
-    std::string openedAs_ ZOR_GUARDED_BY(mutex_);
-    std::string disk_ ZOR_GUARDED_BY(mutex_);
     std::vector<LogLine> lines_ ZOR_GUARDED_BY(mutex_);
 };
 

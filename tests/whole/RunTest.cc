@@ -23,6 +23,11 @@ namespace {
 namespace files = std::filesystem;
 using Words = std::vector<std::string>;
 
+Words operator+(Words words, const Words& more) {
+    words.insert(words.end(), more.begin(), more.end());
+    return words;
+}
+
 const std::string notes = "org.example.notes";
 const std::string maps = "org.example.maps";
 
@@ -82,9 +87,7 @@ public:
         return daemon.client().groupContainerPaths(501, identifier).value()[group];
     }
     [[nodiscard]] Words words(const std::string& identifier, const Words& more) const {
-        Words all = {program, "--root", daemon.root(), "--identifier", identifier, "--user", "501"};
-        all.insert(all.end(), more.begin(), more.end());
-        return all;
+        return Words{program, "--root", daemon.root(), "--identifier", identifier, "--user", "501"} + more;
     }
     [[nodiscard]] Outcome run(const std::string& identifier, const Words& more) const {
         return runProgram(words(identifier, more));
@@ -131,10 +134,7 @@ TEST(Run, AnAssertionTakenMeanwhile) {
     files::create_directories(launcher.daemon.path("run/zorvane/assertions"));
     for (const bool waits : {false, true}) {
         ::kill(launcher.daemon.pid(), SIGSTOP);
-        Words words = {"--", "sh", "-c", "echo $HOME"};
-        if (waits)
-            words.insert(words.begin(), "--wait");
-        Program run(launcher.words(notes, words));
+        Program run(launcher.words(notes, Words(waits ? 1 : 0, "--wait") + Words{"--", "sh", "-c", "echo $HOME"}));
         const std::string descriptors = "/proc/" + std::to_string(run.pid()) + "/fd";
         EXPECT_TRUE(waitUntil([&] {
             return std::ranges::any_of(files::directory_iterator(descriptors), [](const auto& entry) {
@@ -182,16 +182,12 @@ TEST(Run, CommandLines) {
         {{"--inside", "0", "0", "none", "/", "sh"}, 125, "itself"},
         {{"--identifier", "a.b", "--user", "501", "--root", empty.path(), "sh", "--user"}, 125, "What to do: "},
     };
-    for (auto [words, exitCode, says] : rows) {
-        words.insert(words.begin(), programPath("zorvane-run"));
-        expectOutcome(runProgram(words), exitCode, says);
-    }
+    for (const auto& [words, exitCode, says] : rows)
+        expectOutcome(runProgram(Words{programPath("zorvane-run")} + words), exitCode, says);
     if (::geteuid() == 0) {
         Launcher launcher;
-        Words words = {"/usr/bin/setpriv", "--reuid", "501", "--clear-groups"};
-        const Words mine = launcher.words(notes, {"sh"});
-        words.insert(words.end(), mine.begin(), mine.end());
-        expectOutcome(runProgram(words), 125, "needs root");
+        const Words unprivileged = {"/usr/bin/setpriv", "--reuid", "501", "--clear-groups"};
+        expectOutcome(runProgram(unprivileged + launcher.words(notes, {"sh"})), 125, "needs root");
     }
 }
 
@@ -294,10 +290,9 @@ TEST(Run, ExitCodesAndSignals) {
         const auto outcome = launcher.run(notes, words);
         EXPECT_EQ(outcome.exitStatus, exitCode) << words.back() << ": " << outcome.output;
     }
-    Words careless = {"/usr/bin/env", "--ignore-signal=CHLD"};
-    const Words exits = launcher.words(notes, {"--", "sh", "-c", "exit 9"});
-    careless.insert(careless.end(), exits.begin(), exits.end());
-    EXPECT_EQ(runProgram(careless).exitStatus, 9) << "from a caller that does not wait for its children";
+    const Words careless = {"/usr/bin/env", "--ignore-signal=CHLD"};
+    EXPECT_EQ(runProgram(careless + launcher.words(notes, {"--", "sh", "-c", "exit 9"})).exitStatus, 9)
+        << "from a caller that does not wait for its children";
     const std::string ready = launcher.data(notes) + "/ready";
     const std::string wait = "touch $HOME/ready; while :; do sleep 0.02; done";
     // Sends a signal once the file is there.
@@ -339,9 +334,8 @@ TEST(Run, NothingOutlivesTheLauncher) {
     constexpr int moments = 40;
     for (int moment = 0; moment < moments + 2; ++moment) {
         SCOPED_TRACE(moment);
-        Words words = {"--", "sh", "-c", "touch $HOME/ready; sleep 60"};
-        if (moment == moments)
-            words.insert(words.begin(), {"--bubblewrap", maker});
+        const Words words = (moment == moments ? Words{"--bubblewrap", maker} : Words()) +
+                            Words{"--", "sh", "-c", "touch $HOME/ready; sleep 60"};
         int ends[2] = {};
         ASSERT_EQ(::pipe2(ends, O_CLOEXEC), 0);
         files::remove(ready);
@@ -405,15 +399,9 @@ TEST(Run, StandardDescriptorsLeadNowhere) {
 TEST(Run, HomesThatTheUnitHides) {
     ZOR_NEEDS_SANDBOX();
     const Launcher launcher;
-    Words words = {"/usr/bin/unshare",
-                   "-m",
-                   "sh",
-                   "-c",
-                   "mount -t tmpfs none " + launcher.daemon.path("private/var/mobile") + " && exec \"$@\"",
-                   "sh"};
-    const Words run = launcher.words(notes, {"--", "true"});
-    words.insert(words.end(), run.begin(), run.end());
-    const auto outcome = runProgram(words);
+    const std::string hide = "mount -t tmpfs none " + launcher.daemon.path("private/var/mobile") + " && exec \"$@\"";
+    const auto outcome =
+        runProgram(Words{"/usr/bin/unshare", "-m", "sh", "-c", hide, "sh"} + launcher.words(notes, {"--", "true"}));
     expectOutcome(outcome, 125, "the mount namespace of this process");
     EXPECT_EQ(outcome.output.find("delete"), std::string::npos) << outcome.output;
 }
@@ -449,9 +437,8 @@ TEST(Run, OnlyWhatIsRegistered) {
     };
     for (const Row& row : rows) {
         for (const char* form : {"--dry-run", "--json"}) {
-            Words words = row.words;
-            words.insert(words.end(), {"--dry-run", form, "--", "no-such-program"});
-            const auto outcome = launcher.run(row.identifier, words);
+            const auto outcome =
+                launcher.run(row.identifier, row.words + Words{"--dry-run", form, "--", "no-such-program"});
             EXPECT_EQ(outcome.exitStatus, row.exitCode) << outcome.output;
             for (const std::string& text : row.says)
                 EXPECT_NE(outcome.output.find(text), std::string::npos) << text << " in " << outcome.output;

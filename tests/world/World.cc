@@ -2,7 +2,6 @@
 #include "world/World.h"
 
 #include "plist/Binary.h"
-#include "plist/Read.h"
 
 #include <algorithm>
 #include <cstdio>
@@ -175,12 +174,6 @@ void World::drainDeathRow() {
     reached.get_future().wait();
 }
 
-plist::Dictionary World::readDictionary(std::string_view relative) const {
-    const std::string bytes = read(relative);
-    const auto value = plist::readPropertyList({reinterpret_cast<const std::uint8_t*>(bytes.data()), bytes.size()});
-    return value && value->asDictionary() ? *value->asDictionary() : plist::Dictionary();
-}
-
 std::vector<std::string> World::deathRow() const {
     std::vector<std::string> found;
     for (const std::string& unique : names(dead))
@@ -227,16 +220,6 @@ std::uint32_t ownerOf(ContainerClass containerClass) {
 
 Result<void> World::replace(const FoundContainer* old, const FoundContainer& fresh,
                             ZORClientConnection::PreserveOldUUID preserve) {
-    return daemonsClient().replaceContainer(swapOf(old, fresh, preserve), StartDeletionThread::no);
-}
-
-ZORClientConnection::ContainerAddress addressOf(const FoundContainer& container) {
-    const ZORMetadata& record = *container.record;
-    return {record.uid(), container.uuid, record.identifier(), record.containerClass()};
-}
-
-ZORClientConnection::ReplaceRequest swapOf(const FoundContainer* old, const FoundContainer& fresh,
-                                           ZORClientConnection::PreserveOldUUID preserve) {
     ZORClientConnection::ReplaceRequest request{.newUuid = fresh.uuid,
                                                 .userIdNew = fresh.record->uid(),
                                                 .identifierNew = fresh.record->identifier(),
@@ -248,7 +231,12 @@ ZORClientConnection::ReplaceRequest swapOf(const FoundContainer* old, const Foun
         request.identifierOld = old->record->identifier();
         request.classOld = old->record->containerClass();
     }
-    return request;
+    return daemonsClient().replaceContainer(request, StartDeletionThread::no);
+}
+
+ZORClientConnection::ContainerAddress addressOf(const FoundContainer& container) {
+    const ZORMetadata& record = *container.record;
+    return {record.uid(), container.uuid, record.identifier(), record.containerClass()};
 }
 
 std::string nameOf(const std::string& path) {

@@ -168,8 +168,6 @@ public:
     void link(const std::string& target, const std::string& place) const;
     [[nodiscard]] FileURL url(std::string_view relative) const { return FileURL::directory(path(relative)); }
     [[nodiscard]] std::string relative(const std::string& absolute) const { return absolute.substr(path().size() + 1); }
-    /// Empty when there is none.
-    [[nodiscard]] plist::Dictionary readDictionary(std::string_view relative) const;
     /// What is under death row's unique directories, sorted.
     [[nodiscard]] std::vector<std::string> deathRow() const;
 
@@ -219,10 +217,6 @@ plist::Dictionary metadataOf(std::uint64_t containerClass, std::uint32_t userId,
                              const std::string& uuid = "00000000-0000-4000-8000-000000000001");
 std::string binary(const plist::Value& value);
 ZORClientConnection::ContainerAddress addressOf(const FoundContainer& container);
-ZORClientConnection::ReplaceRequest
-swapOf(const FoundContainer* old, const FoundContainer& fresh,
-       ZORClientConnection::PreserveOldUUID preserve = ZORClientConnection::PreserveOldUUID::no);
-
 /// The user whose containers of a class the tests make.
 std::uint32_t ownerOf(ContainerClass containerClass);
 std::string nameOf(const std::string& path);
