@@ -204,10 +204,8 @@ std::vector<Scenario> allScenarios() {
     return all;
 }
 
-std::vector<Scenario> homeScenarios() {
+std::vector<Scenario> homeScenarios(const std::set<std::string>& always) {
     std::vector<Scenario> atHome = allScenarios();
-    // Those that have found faults of their own; each of the others takes as long for what these find too.
-    const std::set<std::string> always = {"replace", "recovery of a replace"};
     std::erase_if(atHome, [&](const Scenario& scenario) {
         return !scenario.worksAtHome || (!isLongRun() && !always.contains(scenario.name));
     });

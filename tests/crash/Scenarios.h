@@ -5,6 +5,7 @@
 #include "crash/StoreWorld.h"
 
 #include <gtest/gtest.h>
+#include <set>
 
 namespace zor::support {
 
@@ -53,9 +54,9 @@ std::vector<Scenario> storeScenarios();
 std::vector<Scenario> changeScenarios();
 /// Deletion, the loss of last references, and the first use of groups.
 std::vector<Scenario> deletionScenarios();
-/// All of them, or those that work in the user's home.
+/// All of them, or those that work in the user's home: in a run that is not a long one only the ones named.
 std::vector<Scenario> allScenarios();
-std::vector<Scenario> homeScenarios();
+std::vector<Scenario> homeScenarios(const std::set<std::string>& always);
 /// `scenario`, as one of these.
 Scenario atHome(Scenario scenario);
 /// As test names are spelled.

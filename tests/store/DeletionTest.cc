@@ -98,6 +98,13 @@ TEST_F(Deletion, WhatGoesWithEachClass) {
         EXPECT_EQ(mapping.entryCount(), isBundleClass(containerClass) ? 0U : 3U);
         EXPECT_EQ(world.names(mappings).size(), perUser ? 1U : 2U);
     }
+    // One that a power cut may bring back is no success.
+    const FoundContainer unsynced = world.make("unsynced");
+    world.disk().arm({.span = support::FaultSpan::fromThenOn, .filter = [](const DiskCallInfo& call) {
+                          return call.call == DiskCall::sync || call.call == DiskCall::syncFileSystem;
+                      }});
+    EXPECT_EQ(world.stage(unsynced), ErrorCode::listForDeletionFailed);
+    world.disk().disarm();
     // A mapping that stays keeps no container.
     world.sandbox.removeError = EIO;
     const FoundContainer last = world.make("last");

@@ -160,22 +160,16 @@ TEST(Syncs, AreWaitedForWithoutTheLock) {
     const Dictionary groups{{std::string(entitlementKeys::applicationGroups), plist::Array{"group"}},
                             {std::string(entitlementKeys::systemContainer), true}};
     const auto registers = [&](World& world, const Dictionary& entitlements) {
-        return world.services().store().entitlementChange.processEntitlements(&entitlements, &id, nullptr) ==
-               ErrorCode::success;
+        return world.entitle(id, entitlements) == ErrorCode::success;
+    };
+    const auto deletes = [&](World& world, ContainerClass containerClass) {
+        return world.stage(*world.find(id, containerClass)) == ErrorCode::success;
     };
     const std::pair<const char*, std::function<bool(World&)>> rows[] = {
         {"creation", [](World& world) { return world.create("new").has_value(); }},
         {"registration", [&](World& world) { return registers(world, Dictionary{{"k", 1}}); }},
-        {"deletion of a bundle",
-         [&](World& world) {
-             return world.daemonsClient()
-                 .deleteContainerForUser(33, &id, ContainerClass::bundleApplication, false)
-                 .has_value();
-         }},
-        {"deletion",
-         [&](World& world) {
-             return world.daemonsClient().deleteContainerForUser(mobile, &id, application, false).has_value();
-         }},
+        {"deletion of a bundle", [&](World& world) { return deletes(world, ContainerClass::bundleApplication); }},
+        {"deletion", [&](World& world) { return deletes(world, application); }},
     };
     for (const auto& [name, operation] : rows)
         for (const auto ordering : {fs::Ordering::journal, fs::Ordering::none}) {
