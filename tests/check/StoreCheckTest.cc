@@ -280,26 +280,6 @@ TEST(StoreCheckTest, FindsEachDamageAndChangesNothing) {
     }
 }
 
-// Goal: of two containers of one identifier, the one that a running daemon serves is never moved away. Method: a daemon
-// that says either of them, another one, or nothing.
-TEST(StoreCheckTest, AsksTheDaemonWhichOneOfTwoItServes) {
-    Store store;
-    const std::string copy = store.sibling(uuid);
-    ASSERT_EQ(std::system(("cp -a " + store.data + " " + copy).c_str()), 0);
-    for (const std::string& served : {store.data, copy, std::string("/elsewhere"), std::string()}) {
-        const CheckOptions options{
-            .daemonServes = true,
-            .servedPath = [&](ContainerClass, std::uint32_t,
-                              const std::string&) { return served.empty() ? std::nullopt : std::optional(served); },
-            .pause = std::chrono::milliseconds(0)};
-        const auto findings = store.check(options);
-        ASSERT_EQ(findings.size(), 1U) << textOf(findings);
-        const bool known = served == store.data || served == copy;
-        EXPECT_EQ(findings[0].what.find("does not say") == std::string::npos, known) << findings[0].what;
-        EXPECT_FALSE(served.ends_with(findings[0].path)) << findings[0].path;
-    }
-}
-
 // Goal: what is as it should be is no finding. Method: a reference without a container, a mapping that leads to one, a
 // pending change, a container under a well-known name, a missing marker without and with a daemon.
 TEST(StoreCheckTest, KnowsWhatIsNoFault) {
@@ -320,33 +300,6 @@ TEST(StoreCheckTest, KnowsWhatIsNoFault) {
     EXPECT_TRUE(isWhole(store.check(options)));
     options.daemonServes = true;
     EXPECT_FALSE(isWhole(store.check(options)));
-}
-
-// Goal: info values, or a recorded protection class, that the daemon shows and could not write are found, and are not
-// any more once they are written. Method: a disk that is full for one of two writes.
-TEST(StoreCheckTest, FindsInfoThatWasNotWritten) {
-    Store store;
-    const std::string key = "key";
-    const plist::Value value("value");
-    const auto set = [&] {
-        return store.world.daemonsClient()
-            .setInfoValue(&value, &key, test::addressOf(store.world.make("org.data")), UseLocking::yes)
-            .has_value();
-    };
-    const auto check = [&] {
-        CheckOptions options{.pause = std::chrono::milliseconds(0)};
-        for (const UUID& one : store.world.services().cache().withUnsavedInfo())
-            options.unsavedInfo.insert(one.string());
-        return store.check(options);
-    };
-    store.world.refuse(support::DiskCall::write, ENOSPC);
-    EXPECT_FALSE(set());
-    const auto findings = check();
-    ASSERT_EQ(findings.size(), 1U) << textOf(findings);
-    EXPECT_EQ(findings[0].code, FindingCode::infoUnsaved);
-    store.world.disk().disarm();
-    EXPECT_TRUE(set());
-    EXPECT_EQ(textOf(check()), "");
 }
 
 // Goal: what a request in flight shows is not reported. Method: threads that make, wipe and delete containers without

@@ -69,7 +69,7 @@ TEST_F(Shortage, JournalsThatCannotBeReadKeepWhatTheyName) {
 TEST_F(Shortage, EachOperationWithFewDescriptors) {
     constexpr rlim_t comings = 30;
     rlim_t round = 0;
-    constexpr std::size_t others = 40;
+    constexpr std::size_t others = 300; // two threads read a class directory with so many
     for (std::size_t i = 0; i < others; ++i)
         (void)world.make("other" + std::to_string(i));
     const FoundContainer kept = world.make("kept");

@@ -1,18 +1,16 @@
 // SPDX-License-Identifier: Apache-2.0
-// The daemon's life as its users see it: killed at any moment, started twice, told to stop, asked by its tool.
+// The daemon's life as its users see it: started twice, told to stop, kept short, asked by its tool.
 #include "os/FileDescriptor.h"
 #include "process/DaemonProcess.h"
 #include "process/JsonSchema.h"
 #include "whole/Expect.h"
 
 #include <algorithm>
-#include <atomic>
 #include <cerrno>
 #include <csignal>
 #include <cstring>
 #include <filesystem>
 #include <fstream>
-#include <future>
 #include <gtest/gtest.h>
 #include <poll.h>
 #include <sched.h>
@@ -355,40 +353,6 @@ TEST(Tool, HelpPageCompletionAndSchemasAgree) {
                         "; COMP_WORDS=(zorvanectl --root " + daemon.root() +
                         " lookup org); COMP_CWORD=4; _zorvanectl; echo \"${COMPREPLY[@]}\""});
     EXPECT_EQ(shell.output, "org.plain\n");
-}
-
-// Goal: a change of protection class that waits for an unlock ends with the daemon: its client hears so, nothing of it
-// is recorded or on disk, and asking again works. Method: a locked device, SIGKILL once the change is said to wait.
-TEST(Life, KilledWhileAChangeOfProtectionWaits) {
-    DaemonProcess daemon;
-    daemon.start();
-    const std::vector<std::string> show = {"--json", "protection", "a.b", "--class", "2"};
-    expectCall(daemon, {{"create", "a.b", "--class", "2"}, 0, "created"});
-    expectCall(daemon, {{"protect", "a.b", "3", "--class", "2", "--third-party"}, 0, "has class 3"});
-    expectCall(daemon, {{"lock-state", "1"}, 0, "locked"});
-    auto waiting = std::async(std::launch::async, [&daemon] {
-        return daemon.client().setDataProtection({.containerClass = dataApplication,
-                                                  .user = mobile,
-                                                  .identifier = "a.b",
-                                                  .protectionClass = 1,
-                                                  .thirdParty = true,
-                                                  .retryIfLocked = true});
-    });
-    bool waits = false;
-    for (int tries = 0; tries < 200 && !waits; ++tries)
-        waits = daemon.tool(show).output.find("\"waitsForUnlock\": true") != std::string::npos;
-    ASSERT_TRUE(waits);
-    daemon.kill();
-    const auto answer = waiting.get();
-    ASSERT_FALSE(answer);
-    EXPECT_EQ(answer.error().kind, zorvane::Error::Kind::unreachable) << answer.error().message;
-    daemon.start();
-    expectCall(daemon, {show, 0, "\"pending\": null"});
-    expectCall(daemon, {show, 0, "\"recorded\": 3"});
-    expectCall(daemon, {{"lock-state", "0"}, 0, "unlocked"});
-    expectCall(daemon, {show, 0, "\"recorded\": 3"});
-    expectCall(daemon, {{"protect", "a.b", "1", "--class", "2", "--third-party"}, 0, "has class 1"});
-    expectCall(daemon, {show, 0, "\"recorded\": 1"});
 }
 
 // Goal: what the daemon shows and a full disk did not take is found, until it is saved. Method: a small file system.
