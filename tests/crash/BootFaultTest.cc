@@ -167,7 +167,7 @@ TEST(BootPowerCutTest, TheNextBootFinishesIt) {
         ASSERT_EQ(disk.complaint(), "");
         const LoopReport report = forEachPowerCut(
             disk.log(),
-            {.model = model, .randomStatesPerCut = isLongRun() ? 8U : 2U, .singleChangesMax = isLongRun() ? 24U : 8U},
+            {.model = model, .randomStatesPerCut = isLongRun() ? 8U : 1U, .singleChangesMax = isLongRun() ? 24U : 4U},
             [](const PowerCutState&, const std::string& root) { return judgeNextBoots(root, Bundle::known); });
         EXPECT_EQ(report.complaint, "");
         EXPECT_GT(report.examined, 30U);

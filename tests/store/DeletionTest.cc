@@ -1,11 +1,15 @@
 // SPDX-License-Identifier: Apache-2.0
-// Taking containers out of the store: what a batch stages and says, what goes with each class, disks that refuse, and
-// owners who swap what is to be deleted.
+// Taking containers out of the store: what a batch stages and says, what goes with each class, owners who swap what is
+// to be deleted; and death row: what gets there, on which file system, what a pass does with it, and the races of the
+// two.
+#include "fs/Names.h"
 #include "store/ZOREntitlementMapping.h"
 #include "world/World.h"
 
+#include <filesystem>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <thread>
 #include <unistd.h>
 
 namespace zor::test {
@@ -14,7 +18,9 @@ namespace {
 using plist::Dictionary;
 using support::DiskCall;
 using support::DiskCallInfo;
+using support::FaultSpan;
 using Batch = ZORClientConnection::DeletionBatch;
+using Names = std::vector<std::string>;
 
 class Deletion : public testing::Test {
 protected:
@@ -173,6 +179,194 @@ TEST_F(Deletion, TheOwnersNextTreeIsLeftAlone) {
     world.disk().disarm();
     EXPECT_EQ(world.pass(), ErrorCode::success);
     EXPECT_TRUE(put && isThere(container.path));
+}
+
+class DeathRow : public testing::Test {
+protected:
+    DeathRow() { world.load(); }
+    World world;
+
+    Names left() { return world.services().store().deathRow.left().paths; }
+};
+
+// Goal: a pass that takes the fresh unique directory for rubbish costs no item. Method: it goes before the move.
+TEST_F(DeathRow, APassRacesAMove) {
+    for (const bool always : {false, true}) {
+        world.makeDirectories("item");
+        int times = 0;
+        world.disk().arm({.filter = [&](const DiskCallInfo& call) {
+            if (call.call == DiskCall::rename && (always || times == 0)) {
+                ++times;
+                for (const std::string& unique : world.names(dead))
+                    ::rmdir(world.path(dead + "/" + unique).c_str());
+            }
+            return false;
+        }});
+        const auto moved = world.daemonsClient()._moveItemAtURLToDeathRow(world.url("item"), StartDeletionThread::no);
+        world.disk().disarm();
+        EXPECT_EQ(codeOf(moved), always ? ErrorCode::moveToDeathRowFailed : ErrorCode::success);
+        EXPECT_EQ(world.exists("item"), always);
+        EXPECT_EQ(times > 10, always);
+        EXPECT_EQ(world.deathRow(), always ? Names() : Names{"item"});
+        EXPECT_EQ(world.pass(), ErrorCode::success);
+    }
+}
+
+// Goal: what cannot be removed goes to /tmp, closed, or stays, and is shown and tried again; others go. Method: removal
+// and move fail.
+TEST_F(DeathRow, WhatCannotBeRemoved) {
+    bool movesFail = true;
+    const support::Fault stuck{
+        .error = EACCES, .span = FaultSpan::fromThenOn, .filter = [&](const DiskCallInfo& call) {
+            return (call.call == DiskCall::unlinkFile && call.subject == "stuck") ||
+                   (call.call == DiskCall::removeDirectory && call.subject.starts_with("temp.x")) ||
+                   (movesFail && call.call == DiskCall::rename && call.subject.starts_with("temp."));
+        }};
+    world.write(dead + "/temp.xxxxxx/bundle/stuck", "");
+    world.makeDirectories(dead + "/temp.yyyyyy/other");
+    world.disk().arm(stuck);
+    EXPECT_EQ(world.pass(), ErrorCode::deathRowItemNotDestroyed);
+    EXPECT_EQ(world.names(dead), (Names{"temp.xxxxxx"}));
+    EXPECT_EQ(left(), (Names{world.path(dead + "/temp.xxxxxx")}));
+    movesFail = false;
+    world.disk().arm(stuck);
+    // Another's directory there is not ours.
+    world.makeDirectories("tmp/temp.zzzzzz/precious", 0, 0700);
+    for (const bool restarts : {false, false, true}) {
+        if (restarts)
+            world.restart();
+        EXPECT_EQ(world.pass(), ErrorCode::success);
+        EXPECT_TRUE(world.names(dead).empty() && world.exists("tmp/temp.xxxxxx/bundle/stuck"));
+        EXPECT_EQ(world.item("tmp/temp.xxxxxx"), directoryOf(0, 0700));
+        EXPECT_EQ(left(), (Names{world.path("tmp/temp.xxxxxx")}));
+    }
+    world.disk().disarm();
+    EXPECT_EQ(world.pass(), ErrorCode::success);
+    EXPECT_EQ(world.names("tmp"), (Names{"temp.zzzzzz"}));
+    EXPECT_TRUE(world.exists("tmp/temp.zzzzzz/precious"));
+    EXPECT_TRUE(left().empty());
+}
+
+// Goal: what ends the removal of one item ends neither the pass nor the daemon. Method: memory runs out for one.
+TEST_F(DeathRow, WantOfMemoryKeepsOneItem) {
+    for (const char* item : {"temp.aaaaaa", "temp.short1", "temp.zzzzzz"})
+        world.makeDirectories(dead + "/" + item);
+    world.disk().arm({.filter = [](const DiskCallInfo& call) -> bool {
+        return call.subject == "temp.short1" ? throw std::bad_alloc() : false;
+    }});
+    EXPECT_EQ(world.pass(), ErrorCode::deathRowItemNotDestroyed);
+    world.disk().disarm();
+    EXPECT_EQ(world.names(dead), (Names{"temp.short1"}));
+    EXPECT_EQ(world.pass(), ErrorCode::success);
+}
+
+const std::string rowOuter = std::string("private/var/mobile/") + fs::deathRowOuter;
+
+// Goal: a container on another file system goes by a rename, whatever is in it, and is found again after a stop.
+// Method: transient, live and all transient ones at a boot, each with what no copy can make; calls are counted.
+TEST(DeathRowElsewhere, ContainersGoByARename) {
+    if (!MountedHome::canBe())
+        GTEST_SKIP() << "skipped: needs root to mount";
+    World world;
+    const MountedHome home(world.path());
+    ASSERT_TRUE(home.mounted());
+    world.load();
+    enum class Way { askedAgain, deleted, boot };
+    for (const Way way : {Way::askedAgain, Way::deleted, Way::boot}) {
+        SCOPED_TRACE(static_cast<int>(way));
+        const FoundContainer container = world.make("app", application, way != Way::deleted);
+        for (int i = 0; i < 300; ++i)
+            ASSERT_EQ(::mkdir((container.path + "/tmp/" + std::to_string(i)).c_str(), 0755), 0);
+        ASSERT_EQ(::mknod((container.path + "/whiteout").c_str(), S_IFCHR, 0), 0);
+        int calls = 0;
+        // A pass may run beside it.
+        world.disk().arm({.filter = [&, here = std::this_thread::get_id()](const DiskCallInfo&) {
+            return std::this_thread::get_id() == here && ++calls == 0;
+        }});
+        if (way == Way::askedAgain)
+            EXPECT_EQ(codeOf(world.find("app", application, true)), ErrorCode::notFound);
+        else if (way == Way::deleted)
+            EXPECT_EQ(world.stage(container), ErrorCode::success);
+        else
+            world.daemonsClient().rebootContainerManagerSetup();
+        world.disk().disarm();
+        EXPECT_LT(calls, 200);
+        EXPECT_FALSE(isThere(container.path));
+        if (way == Way::askedAgain)
+            world.drainDeathRow();
+        else
+            EXPECT_EQ(world.item(rowOuter), directoryOf(0, 0700));
+        world.restart();
+        EXPECT_EQ(world.pass(), ErrorCode::success);
+        EXPECT_FALSE(world.exists(rowOuter));
+        EXPECT_TRUE(world.names(dead).empty());
+    }
+}
+
+// Goal: whatever lies under the row's name, only what the daemon put in is removed. Method: a user's and root's things.
+TEST(DeathRowElsewhere, WhoseNameIsTaken) {
+    if (!MountedHome::canBe())
+        GTEST_SKIP() << "skipped: needs root to mount";
+    World world;
+    const MountedHome home(world.path());
+    ASSERT_TRUE(home.mounted());
+    world.load();
+    const std::tuple<std::uint32_t, mode_t, bool> rows[] = {{mobile, 0700, false}, {0, 0755, false}, {0, 0700, true}};
+    for (const auto& [owner, mode, works] : rows) {
+        SCOPED_TRACE(std::to_string(owner) + " " + std::to_string(mode));
+        const std::string app = "app" + std::to_string(owner + mode);
+        (void)world.make(app, application, true);
+        world.makeDirectories(rowOuter + "/precious", 0, 0700);
+        ASSERT_EQ(::chown(world.path(rowOuter).c_str(), owner, owner) | ::chmod(world.path(rowOuter).c_str(), mode), 0);
+        EXPECT_EQ(codeOf(world.create(app, application, true)),
+                  works ? ErrorCode::success : ErrorCode::transientRemovalFailed);
+        EXPECT_EQ(world.pass(), ErrorCode::success);
+        EXPECT_EQ(world.names(rowOuter), Names{"precious"});
+        EXPECT_EQ(world.item(rowOuter), directoryOf(owner, mode));
+        std::filesystem::remove_all(world.path(rowOuter));
+    }
+}
+
+// Goal: another user's directory in a container's place is not taken for it. Method: it lies there before, or is put
+// there just before the move; then the container is asked for or deleted.
+TEST_F(DeathRow, AnothersDirectoryInAContainersPlace) {
+    if (::geteuid() != 0)
+        GTEST_SKIP() << "skipped: only root can give directories away";
+    for (const bool asksAgain : {true, false})
+        for (const bool meanwhile : {false, true}) {
+            SCOPED_TRACE(std::string(asksAgain ? "asked again" : "deleted") + (meanwhile ? " meanwhile" : " before"));
+            const FoundContainer container = world.make("app", application, asksAgain);
+            const std::string& place = container.path;
+            world.makeDirectories("precious", 0, 0700);
+            world.makeDirectories("precious/file");
+            bool swapped = false;
+            const auto swap = [&](const DiskCallInfo& call) {
+                if (!swapped && call.call == DiskCall::rename && call.subject.starts_with(nameOf(place))) {
+                    swapped = true;
+                    world.move(place, "aside");
+                    world.move("precious", place);
+                }
+                return false;
+            };
+            if (meanwhile)
+                world.disk().arm({.filter = swap});
+            else
+                swap({.call = DiskCall::rename, .subject = nameOf(place)});
+            if (asksAgain)
+                (void)world.create("app", application, true);
+            else
+                (void)world.stage(container);
+            world.drainDeathRow();
+            world.disk().disarm();
+            EXPECT_TRUE(swapped);
+            EXPECT_EQ(world.pass(), ErrorCode::success);
+            EXPECT_TRUE(isThere(place + "/file"));
+            EXPECT_EQ(itemAt(place), directoryOf(0, 0700));
+            for (const char* left : {"aside", "private/var/mobile/Containers"})
+                std::filesystem::remove_all(world.path(left));
+            world.restart();
+            world.load();
+        }
 }
 
 } // namespace
