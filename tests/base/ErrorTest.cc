@@ -3,21 +3,15 @@
 #include "base/Format.h"
 #include "base/ZORException.h"
 #include "device/FileCrashAnnotation.h"
-#include "os/LinuxDisk.h"
 #include "os/Names.h"
-#include "support/FileTree.h"
 #include "support/RecordingLog.h"
 #include "support/SettableRoles.h"
+#include "support/TestRoot.h"
+#include "support/Waiting.h"
 
-#include <csignal>
-#include <filesystem>
-#include <fstream>
 #include <gtest/gtest.h>
-#include <pthread.h>
 #include <sys/resource.h>
 #include <sys/wait.h>
-#include <thread>
-#include <unistd.h>
 
 namespace zor {
 namespace {
@@ -54,35 +48,28 @@ TEST(Log, LevelGate) {
 
 // On an internal build the process dies with the first report in its file: a child whose threads all fail at once.
 TEST(ExceptionBoundary, AnInternalBuildAbortsWithTheFirstReport) {
-    const support::TemporaryDirectory directory;
-    const std::string logs = directory.path() + "/" + platform::names::logDirectory;
-    std::filesystem::create_directories(logs);
+    const support::TestRoot root;
+    const std::string file = std::string(platform::names::logDirectory) + "/" + platform::names::crashFile;
+    root.makeDirectories(platform::names::logDirectory);
     const pid_t child = ::fork();
-    ASSERT_GE(child, 0);
     if (child == 0) {
-        const struct rlimit noCore{};
+        const rlimit noCore{};
         ::setrlimit(RLIMIT_CORE, &noCore);
-        auto root = platform::SystemRoot::open(directory.path());
-        platform::LinuxDisk disk(platform::Syncs::off);
-        platform::FileCrashAnnotation annotation(*root, disk);
+        platform::FileCrashAnnotation annotation(root.root(), root.disk());
         support::RecordingLog sink(logLevelNotice);
         const Log log(sink);
         const support::SettableBuild build(true);
         ExceptionBoundary boundary(log, build, annotation);
-        std::vector<std::jthread> threads;
-        for (int i = 0; i < 4; ++i)
-            threads.emplace_back([&] {
-                ::pthread_setname_np(::pthread_self(), "worker");
-                (void)boundary.run({"lookup", 1}, []() -> Result<int> { throw ZORException("Range", "5 beyond 4"); });
-            });
-        threads.clear();
+        support::inThreads(4, [&](unsigned) {
+            ::pthread_setname_np(::pthread_self(), "worker");
+            (void)boundary.run({"lookup", 1}, []() -> Result<int> { throw ZORException("Range", "5 beyond 4"); });
+        });
         ::_exit(0);
     }
     int status = 0;
     ASSERT_EQ(::waitpid(child, &status, 0), child);
     EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGABRT) << status;
-    std::ifstream file(logs + "/" + platform::names::crashFile);
-    const std::string report{std::istreambuf_iterator<char>(file), {}};
+    const std::string report = root.read(file);
     EXPECT_TRUE(report.starts_with("** INTERNAL ERROR: Uncaught Exception **\n"
                                    "Exception: <worker> Range: 5 beyond 4\nStack:\n"))
         << report;
@@ -91,15 +78,13 @@ TEST(ExceptionBoundary, AnInternalBuildAbortsWithTheFirstReport) {
 
 // Any string is one visible path component, and no two are the same.
 TEST(PercentEncoding, IsOneComponentAndReversible) {
-    const std::pair<std::string, const char*> cases[] = {
-        {"com.veltra.App-1_b", "com.veltra.App-1_b"},
-        {"..", "%2E."},
-        {"a/b", "a%2Fb"},
-        {"%2E", "%252E"},
-        {"\xc3\xa9", "%C3%A9"},
-        {"a b\n", "a%20b%0A"},
-        {std::string("\0", 1), "%00"},
-    };
+    const std::pair<std::string, const char*> cases[] = {{"com.App-1_b", "com.App-1_b"},
+                                                         {"..", "%2E."},
+                                                         {"a/b", "a%2Fb"},
+                                                         {"%2E", "%252E"},
+                                                         {"\xc3\xa9", "%C3%A9"},
+                                                         {"a b\n", "a%20b%0A"},
+                                                         {std::string("\0", 1), "%00"}};
     for (const auto& [text, encoded] : cases) {
         EXPECT_EQ(platform::percentEncode(text), encoded);
         EXPECT_EQ(platform::percentDecode(encoded), text);

@@ -5,10 +5,7 @@
 #include "support/Waiting.h"
 
 #include <atomic>
-#include <cerrno>
 #include <gtest/gtest.h>
-#include <optional>
-#include <thread>
 
 namespace zor {
 namespace {
@@ -43,42 +40,40 @@ TEST(UserIdentity, RequestsResolveByClassAndClient) {
         std::uint32_t client;
         std::optional<std::uint32_t> resolved;
     };
-    const Row rows[] = {
-        // Bundle and system classes: the owner, whoever asks.
-        {33, 1, 0, 33},
-        {33, 8, 501, 33},
-        {1, 1, 0, {}},
-        {1, 1, 501, {}},
-        {501, 5, 501, {}},
-        {501, 3, 0, {}},
-        {499, 12, 0, 499},
-        {499, 13, 501, 499},
-        {1, 12, 0, {}},
-        {501, 13, 501, {}},
-        {505, 12, 0, {}},
-        // System clients: 1 is the mobile user whatever the class, others by the table of owners.
-        {1, 2, 0, 507},
-        {1, 2, 500, 507},
-        {1, 0, 0, 507},
-        {1, 14, 0, 507},
-        {505, 2, 0, 505},
-        {510, 11, 499, 510},
-        {511, 2, 0, {}},
-        {500, 2, 0, {}},
-        {0, 2, 0, {}},
-        {501, 14, 0, {}},
-        // Mobile clients act as themselves.
-        {1, 2, 501, 501},
-        {501, 2, 501, 501},
-        {502, 2, 501, {}},
-        {0, 2, 501, {}},
-        {1, 0, 501, 501},
-        {1, 99, 777, 777},
-        {777, 2, 777, 777},
-        {507, 7, 501, {}},
-        // A class of more than 32 bits is none of these.
-        {501, (std::uint64_t{1} << 32) + 2, 0, {}},
-    };
+    const Row rows[] = {// Bundle and system classes: the owner, whoever asks.
+                        {33, 1, 0, 33},
+                        {33, 8, 501, 33},
+                        {1, 1, 0, {}},
+                        {1, 1, 501, {}},
+                        {501, 5, 501, {}},
+                        {501, 3, 0, {}},
+                        {499, 12, 0, 499},
+                        {499, 13, 501, 499},
+                        {1, 12, 0, {}},
+                        {501, 13, 501, {}},
+                        {505, 12, 0, {}},
+                        // System clients: 1 is the mobile user whatever the class, others by the table of owners.
+                        {1, 2, 0, 507},
+                        {1, 2, 500, 507},
+                        {1, 0, 0, 507},
+                        {1, 14, 0, 507},
+                        {505, 2, 0, 505},
+                        {510, 11, 499, 510},
+                        {511, 2, 0, {}},
+                        {500, 2, 0, {}},
+                        {0, 2, 0, {}},
+                        {501, 14, 0, {}},
+                        // Mobile clients act as themselves.
+                        {1, 2, 501, 501},
+                        {501, 2, 501, 501},
+                        {502, 2, 501, {}},
+                        {0, 2, 501, {}},
+                        {1, 0, 501, 501},
+                        {1, 99, 777, 777},
+                        {777, 2, 777, 777},
+                        {507, 7, 501, {}},
+                        // A class of more than 32 bits is none of these.
+                        {501, (std::uint64_t{1} << 32) + 2, 0, {}}};
     for (const Row& row : rows) {
         support::RecordingLog sink(logLevelNotice);
         const Log log(sink);
@@ -89,14 +84,9 @@ TEST(UserIdentity, RequestsResolveByClassAndClient) {
         const std::string text = formatted("Invalid userId %u for class %llu from client %u", row.requested,
                                            static_cast<unsigned long long>(row.containerClass), row.client);
         const auto lines = sink.take();
-        ASSERT_EQ(resolved.has_value(), row.resolved.has_value()) << text;
-        if (row.resolved) {
-            EXPECT_EQ(*resolved, *row.resolved) << text;
-            EXPECT_FALSE(support::hasLine(lines, 3, "validateUserId", text));
-        } else {
-            EXPECT_TRUE(resolved.error().is(ErrorCode::valueNotAllowed)) << text;
-            EXPECT_EQ(lines, (std::vector<support::LogLine>{{3, "validateUserId", text}}));
-        }
+        EXPECT_EQ(resolved ? std::optional(*resolved) : std::nullopt, row.resolved) << text;
+        EXPECT_TRUE(resolved || resolved.error().is(ErrorCode::valueNotAllowed)) << text;
+        EXPECT_EQ(support::hasLine(lines, 3, "validateUserId", text), !resolved);
     }
 }
 

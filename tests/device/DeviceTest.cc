@@ -1,6 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "device/DeviceQueries.h"
-#include "device/FileCrashAnnotation.h"
 #include "device/FileDeviceLockState.h"
 #include "device/LinkSandboxUserState.h"
 #include "device/SemaphoreBootMarker.h"
@@ -15,12 +14,10 @@
 #include <cstring>
 #include <fcntl.h>
 #include <filesystem>
-#include <functional>
 #include <gtest/gtest.h>
 #include <span>
 #include <sys/wait.h>
 #include <sys/xattr.h>
-#include <unistd.h>
 
 namespace zor::platform {
 namespace {
@@ -99,8 +96,7 @@ TEST(BootMarker, BelievesOnlyItsOwn) {
     marker.forget();
     EXPECT_FALSE(marker.look().present);
     test.write(std::string(names::runtimeDirectory) + "/" + names::bootMarkerFile,
-               "00000000-0000-4000-8000-000000000000\n");
-    ::chmod(file.c_str(), 0400);
+               "00000000-0000-4000-8000-000000000000\n", 0400);
     EXPECT_FALSE(marker.look().present);
     marker.forget();
 }
@@ -112,16 +108,9 @@ TEST(DeviceLockState, ReadsANumberOrNothing) {
     const FileDeviceLockState state(test.root());
     const std::string file = test.path(lockStateFile);
     EXPECT_EQ(state.currentState(), 0);
-    for (const auto& [text, number] : {std::pair("0", 0),
-                                       {"1\n", 1},
-                                       {"2", 2},
-                                       {"-3\n", -3},
-                                       {"", -1},
-                                       {"1 ", -1},
-                                       {"one", -1},
-                                       {"1\n\n", -1},
-                                       {"99999999999", -1},
-                                       {"0x1", -1}}) {
+    const std::pair<const char*, int> rows[] = {{"0", 0},    {"1\n", 1},    {"-3\n", -3},        {"", -1},   {"1 ", -1},
+                                                {"one", -1}, {"1\n\n", -1}, {"99999999999", -1}, {"0x1", -1}};
+    for (const auto& [text, number] : rows) {
         test.replace(lockStateFile, text);
         EXPECT_EQ(state.currentState(), number) << text;
     }
@@ -154,25 +143,6 @@ TEST(DeviceLockState, ForgetsWhatItKeptOfAFileThatChanges) {
     EXPECT_EQ(removed.state.currentState(), 0);
     removed.test.replace(lockStateFile, "4");
     EXPECT_EQ(removed.state.currentState(), 4);
-}
-
-// Every change reaches the loop: rename, removal, writing in place.
-TEST(DeviceLockState, TellsChanges) {
-    const TestRoot test;
-    EpollRunLoop loop;
-    FileDeviceLockState state(test.root());
-    std::atomic<int> seen{-2};
-    ASSERT_EQ(state.registerForChanges(loop, [&] { seen = state.currentState(); }), 0);
-    std::thread runner([&] { loop.run(); });
-    const auto sees = [&](int expected) { return eventually([&] { return seen == expected; }); };
-    test.replace(lockStateFile, "1");
-    EXPECT_TRUE(sees(1));
-    ::unlink(test.path(lockStateFile).c_str());
-    EXPECT_TRUE(sees(0));
-    test.write(lockStateFile, "4");
-    EXPECT_TRUE(sees(4));
-    loop.stop();
-    runner.join();
 }
 
 /// "" when there is no link.
@@ -280,24 +250,29 @@ TEST(FileProtectionClass, RefusesWhatALockTakesAway) {
     EXPECT_EQ(protection.classOf(file.get()), 4);
 }
 
-// Goal: an unlock that is told while its file cannot be opened is not missed. Method: the file changes without a
-// descriptor left, and never again.
+// Goal: every change reaches the loop, rename, removal, writing in place, and an unlock that is told while its file
+// cannot be opened is not missed. Method: the file changes, at last without a descriptor left, and never again.
 TEST(WantOfDescriptors, AnUnlockIsSeenAfterwards) {
     const TestRoot test;
-    const std::string directory = std::string(names::runtimeDirectory) + "/";
     EpollRunLoop loop;
     FileDeviceLockState state(test.root());
-    std::atomic<int> seen{DeviceLockState::locked};
-    test.write(directory + "next", "0");
-    test.write(directory + names::lockState, "1");
+    std::atomic<int> seen{-2};
     ASSERT_EQ(state.registerForChanges(loop, [&] { seen = state.currentState(); }), 0);
     std::thread runner([&] { loop.run(); });
+    const auto sees = [&](int expected) { return eventually([&] { return seen == expected; }); };
+    test.replace(lockStateFile, "1");
+    EXPECT_TRUE(sees(1));
+    ::unlink(test.path(lockStateFile).c_str());
+    EXPECT_TRUE(sees(0));
+    test.write(lockStateFile, "1");
+    EXPECT_TRUE(sees(1));
+    test.write(lockStateFile + ".next", "0");
     {
         const support::FewDescriptors none(0);
-        EXPECT_EQ(::rename(test.path(directory + "next").c_str(), test.path(directory + names::lockState).c_str()), 0);
-        EXPECT_TRUE(eventually([&] { return seen == FileDeviceLockState::unknown; }));
+        EXPECT_EQ(::rename(test.path(lockStateFile + ".next").c_str(), test.path(lockStateFile).c_str()), 0);
+        EXPECT_TRUE(sees(FileDeviceLockState::unknown));
     }
-    EXPECT_TRUE(eventually([&] { return seen == DeviceLockState::unlocked; }));
+    EXPECT_TRUE(sees(DeviceLockState::unlocked));
     loop.stop();
     runner.join();
 }
@@ -307,7 +282,6 @@ TEST(WantOfDescriptors, AnUnlockIsSeenAfterwards) {
 TEST(WantOfNotices, AnUnlockIsSeenAllTheSame) {
     enum { good, notTold, notSeen, stillPolls, cannot };
     const TestRoot test;
-    const std::string file = std::string(names::runtimeDirectory) + "/" + names::lockState;
     const pid_t child = ::fork();
     if (child == 0) {
         const auto allowNotices = [](const char* count) {
@@ -327,7 +301,7 @@ TEST(WantOfNotices, AnUnlockIsSeenAllTheSame) {
             ::_exit(notTold);
         std::thread runner([&] { loop.run(); });
         const auto sees = [&](int next) {
-            test.replace(file, std::to_string(next));
+            test.replace(lockStateFile, std::to_string(next));
             return eventually([&] { return seen == next; });
         };
         bool seenAll = sees(1) && sees(0) && allowNotices("8");

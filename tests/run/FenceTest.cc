@@ -2,13 +2,11 @@
 #include "zorvane-run/Fence.h"
 
 #include <asm/ioctls.h>
-#include <cerrno>
 #include <csignal>
 #include <functional>
 #include <gtest/gtest.h>
 #include <linux/keyctl.h>
 #include <linux/sched.h>
-#include <string>
 #include <sys/prctl.h>
 #include <sys/socket.h>
 #include <sys/syscall.h>

@@ -130,22 +130,20 @@ TEST(Mounts, DirectoriesToReadAreJudged) {
         GTEST_SKIP() << "needs root: the containers of several users";
     World world;
     files::create_directory_symlink(world.below("elsewhere"), world.below("link"));
-    const std::pair<std::string, bool> rows[] = {
-        {world.below("elsewhere"), true},
-        {world.below("private"), false},
-        {world.told.data, false},
-        {world.told.data + "/Documents", false},
-        {world.told.home, false},
-        {world.below("link"), false},
-        {world.below("elsewhere/../x"), false},
-        {world.below("absent"), false},
-        {"relative", false},
-        {"/", false},
-        {"/dev", false},
-        {"/usr/share", false},
-        {"/proc", false},
-        {world.below("elsewhere/"), false},
-    };
+    const std::pair<std::string, bool> rows[] = {{world.below("elsewhere"), true},
+                                                 {world.below("private"), false},
+                                                 {world.told.data, false},
+                                                 {world.told.home, false},
+                                                 {world.told.data + "/Documents", false},
+                                                 {world.below("link"), false},
+                                                 {world.below("absent"), false},
+                                                 {world.below("elsewhere/../x"), false},
+                                                 {"relative", false},
+                                                 {"/", false},
+                                                 {"/dev", false},
+                                                 {"/usr/share", false},
+                                                 {"/proc", false},
+                                                 {world.below("elsewhere/"), false}};
     for (const auto& [path, allowed] : rows) {
         world.options.readOnly = {path};
         EXPECT_EQ(world.open() == "", allowed) << path;

@@ -13,26 +13,19 @@ using namespace zor::upcall;
 
 using Buffer = std::vector<std::uint8_t>;
 
-/// A reply, item by item.
-class Items {
-public:
-    Items& text(std::uint16_t type, const std::string& value) {
-        // As bytes of any kind: what is sent as a string need not be one.
-        sb_packbuff_pack_string(packbuff_.get(), type, value.c_str(), static_cast<std::uint32_t>(value.size()));
-        return *this;
-    }
-    Items& number(std::uint16_t type, std::uint32_t value) {
-        sb_packbuff_pack_uint32(packbuff_.get(), type, value);
-        return *this;
-    }
-    [[nodiscard]] Buffer buffer() const {
-        const std::uint8_t* const bytes = sb_packbuff_get_bytes(packbuff_.get());
-        return {bytes, bytes + sb_packbuff_get_size(packbuff_.get())};
-    }
+/// A reply, item by item. The text is bytes of any kind: what is sent as a string need not be one.
+using Items = std::vector<std::pair<std::uint16_t, std::variant<std::string, std::uint32_t>>>;
 
-private:
-    PackbuffPointer packbuff_{sb_packbuff_new(4096)};
-};
+Buffer packed(const Items& items) {
+    const PackbuffPointer packbuff(sb_packbuff_new(4096));
+    for (const auto& [type, value] : items)
+        if (const auto* const text = std::get_if<std::string>(&value))
+            sb_packbuff_pack_string(packbuff.get(), type, text->c_str(), static_cast<std::uint32_t>(text->size()));
+        else
+            sb_packbuff_pack_uint32(packbuff.get(), type, std::get<std::uint32_t>(value));
+    const std::uint8_t* const bytes = sb_packbuff_get_bytes(packbuff.get());
+    return {bytes, bytes + sb_packbuff_get_size(packbuff.get())};
+}
 
 struct Paths {
     std::string home = "/r/private/var/mobile";
@@ -46,18 +39,17 @@ struct Paths {
     std::uint32_t status = 1;
 
     [[nodiscard]] Items items() const {
-        Items items;
-        items.text(CM_KERN_REPLY_HOME_DIR_PATH, home)
-            .text(CM_KERN_REPLY_DATA_CONTAINER_PATH, data)
-            .text(CM_KERN_REPLY_TEMP_DIR_PATH, temporary)
-            .text(CM_KERN_REPLY_APP_GROUP_ID, group)
-            .text(CM_KERN_REPLY_APP_GROUP_PATH, groupPath)
-            .text(CM_KERN_REPLY_SYSTEM_CONTAINER_PATH, system)
-            .text(CM_KERN_REPLY_SYSTEM_GROUP_ID, systemGroup)
-            .text(CM_KERN_REPLY_SYSTEM_GROUP_PATH, systemGroupPath)
-            .number(CM_KERN_REPLY_STATUS, status);
-        return items;
+        return {{CM_KERN_REPLY_HOME_DIR_PATH, home},
+                {CM_KERN_REPLY_DATA_CONTAINER_PATH, data},
+                {CM_KERN_REPLY_TEMP_DIR_PATH, temporary},
+                {CM_KERN_REPLY_APP_GROUP_ID, group},
+                {CM_KERN_REPLY_APP_GROUP_PATH, groupPath},
+                {CM_KERN_REPLY_SYSTEM_CONTAINER_PATH, system},
+                {CM_KERN_REPLY_SYSTEM_GROUP_ID, systemGroup},
+                {CM_KERN_REPLY_SYSTEM_GROUP_PATH, systemGroupPath},
+                {CM_KERN_REPLY_STATUS, status}};
     }
+    [[nodiscard]] Buffer buffer() const { return packed(items()); }
 };
 
 const WantedContainers wanted{
@@ -71,7 +63,7 @@ std::string problemOf(const Buffer& buffer) {
 
 // A launcher that is root mounts nothing but a container in its place, whatever the answer says: one lie for each row.
 TEST(Reply, EveryLieIsFound) {
-    ASSERT_EQ(problemOf(Paths().items().buffer()), "");
+    ASSERT_EQ(problemOf(Paths().buffer()), "");
     const Paths good;
     const std::string applications = good.home + "/Containers/Data/Application";
     struct Row {
@@ -105,43 +97,40 @@ TEST(Reply, EveryLieIsFound) {
     for (const Row& row : rows) {
         Paths paths;
         paths.*row.path = row.lie;
-        const std::string problem = problemOf(paths.items().buffer());
+        const std::string problem = problemOf(paths.buffer());
         EXPECT_TRUE(problem.contains(row.problem)) << row.what << ": " << problem;
     }
     Paths failed;
     failed.status = 0;
-    EXPECT_TRUE(problemOf(failed.items().buffer()).contains("could not find or make"));
+    EXPECT_TRUE(problemOf(failed.buffer()).contains("could not find or make"));
     Paths nested; // a home in a container
     nested.home = nested.system;
     nested.data = nested.home + "/Containers/Data/Application/A";
     nested.temporary = nested.data + "/tmp";
     nested.groupPath = nested.home + "/Containers/Shared/AppGroup/B";
-    EXPECT_TRUE(problemOf(nested.items().buffer()).contains("inside another"));
+    EXPECT_TRUE(problemOf(nested.buffer()).contains("inside another"));
 }
 
 // An answer of a form that a daemon never sends is none.
 TEST(Reply, EveryWrongFormIsFound) {
     const Paths good;
+    const Items::value_type status{CM_KERN_REPLY_STATUS, 1U};
+    const Items::value_type group{CM_KERN_REPLY_APP_GROUP_ID, "group.a"};
+    const Items::value_type data{CM_KERN_REPLY_DATA_CONTAINER_PATH, good.data};
+    Items twoEnds = good.items();
+    twoEnds.push_back(status);
     const std::pair<const char*, Buffer> rows[] = {
         {"nothing", {}},
-        {"no item", Items().buffer()},
-        {"only a status", Items().number(CM_KERN_REPLY_STATUS, 1).buffer()},
-        {"an item behind the status", good.items().number(CM_KERN_REPLY_STATUS, 1).buffer()},
-        {"a path twice", Items()
-                             .text(CM_KERN_REPLY_DATA_CONTAINER_PATH, good.data)
-                             .text(CM_KERN_REPLY_DATA_CONTAINER_PATH, good.data)
-                             .buffer()},
-        {"a group without a path",
-         Items().text(CM_KERN_REPLY_APP_GROUP_ID, "group.a").number(CM_KERN_REPLY_STATUS, 1).buffer()},
-        {"a group with another kind's path", Items()
-                                                 .text(CM_KERN_REPLY_APP_GROUP_ID, "group.a")
-                                                 .text(CM_KERN_REPLY_SYSTEM_GROUP_PATH, good.systemGroupPath)
-                                                 .buffer()},
-        {"a kind that is not known", Items().text(77, "x").buffer()},
-        {"a NUL in a path", Items().text(CM_KERN_REPLY_DATA_CONTAINER_PATH, good.data + '\0' + "/x").buffer()},
-        {"a status that is text", Items().text(CM_KERN_REPLY_STATUS, "1").buffer()},
-        {"a path that is a number", Items().number(CM_KERN_REPLY_DATA_CONTAINER_PATH, 1).buffer()},
-    };
+        {"no item", packed({})},
+        {"only a status", packed({status})},
+        {"an item behind the status", packed(twoEnds)},
+        {"a path twice", packed({data, data, status})},
+        {"a group without a path", packed({group, status})},
+        {"another kind's path", packed({group, {CM_KERN_REPLY_SYSTEM_GROUP_PATH, good.systemGroupPath}, status})},
+        {"a kind that is not known", packed({{77, "x"}, status})},
+        {"a NUL in a path", packed({{CM_KERN_REPLY_DATA_CONTAINER_PATH, good.data + '\0' + "/x"}, status})},
+        {"a status that is text", packed({{CM_KERN_REPLY_STATUS, "1"}})},
+        {"a path that is a number", packed({{CM_KERN_REPLY_DATA_CONTAINER_PATH, 1U}, status})}};
     for (const auto& [what, buffer] : rows)
         EXPECT_NE(problemOf(buffer), "") << what;
 }
@@ -149,7 +138,7 @@ TEST(Reply, EveryWrongFormIsFound) {
 // Every byte of a good answer in turn takes each of a few values, and every cut: what is still believed is a
 // container's place.
 TEST(Reply, DamageNeverLeadsAway) {
-    const Buffer good = Paths().items().buffer();
+    const Buffer good = Paths().buffer();
     const auto judge = [](const Buffer& buffer) {
         const auto told = readReply(buffer, wanted, root);
         if (!told)
