@@ -23,24 +23,13 @@ struct FaultWorld {
     Device device;
 };
 
-std::unique_ptr<FaultWorld> makeWorld(const std::string& parent, Home home, const Scenario& scenario, FaultKind kind,
-                                      FaultDisk& disk) {
+std::unique_ptr<FaultWorld> makeWorld(const std::string& parent, Home home, const Scenario& scenario, FaultDisk& disk) {
     auto world = std::make_unique<FaultWorld>(disk, parent, home);
     // The setup of the boot has its own scenario; without it, the directories that operations make are missing.
     world->device.marker.make();
     world->device.start(disk, world->probe());
     scenario.prepare(world->device);
-    // A child that ends has to have a daemon of its own.
-    if (kind == FaultKind::exit)
-        world->device.daemon.reset();
     return world;
-}
-
-void act(FaultWorld& world, const Scenario& scenario) {
-    Device& device = world.device;
-    if (!device.daemon)
-        device.daemon = std::make_unique<StoreDaemon>(device.root.path(), device.marker, world.disk, world.probe());
-    scenario.act(device);
 }
 
 std::string judgeRunningDaemon(Device& device, const Scenario& scenario, const FaultOutcome& outcome) {
@@ -91,8 +80,8 @@ void loopOverFaults(const std::string& parent, Home home, const Scenario& scenar
     SCOPED_TRACE(fault.describe());
     platform::LinuxDisk linuxDisk;
     const LoopReport report = forEachFaultPoint(
-        linuxDisk, fault, [&](FaultDisk& disk) { return makeWorld(parent, home, scenario, fault.kind, disk); },
-        [&](const std::unique_ptr<FaultWorld>& world) { act(*world, scenario); },
+        linuxDisk, fault, [&](FaultDisk& disk) { return makeWorld(parent, home, scenario, disk); },
+        [&](const std::unique_ptr<FaultWorld>& world) { scenario.act(world->device); },
         [&](const std::unique_ptr<FaultWorld>& world, const FaultOutcome& outcome) {
             return judge(*world, scenario, outcome);
         });
@@ -105,7 +94,6 @@ const std::vector<Fault> faults = {
     {.kind = FaultKind::error, .error = EACCES},
     {.kind = FaultKind::error, .error = ENOSPC, .span = FaultSpan::fromThenOn},
     {.kind = FaultKind::stop},
-    {.kind = FaultKind::exit},
 };
 
 // Goal: whatever call fails, and wherever the daemon ends, no container is half made under its final name, nothing
@@ -116,9 +104,7 @@ class StoreFaultTest : public ::testing::TestWithParam<Scenario> {};
 
 TEST_P(StoreFaultTest, StandsEveryFault) {
     for (const Fault& fault : faults)
-        // What an end of the process leaves, a stop leaves too: one scenario shows that.
-        if (fault.kind != FaultKind::exit || isLongRun() || GetParam().name == "replace")
-            loopOverFaults("/dev/shm", Home::onRoot, GetParam(), fault);
+        loopOverFaults("/dev/shm", Home::onRoot, GetParam(), fault);
 }
 
 // The same with the user's home on a file system of its own, where a move is a copy and a removal.
@@ -128,7 +114,7 @@ TEST_P(HomeFaultTest, StandsEveryFaultBetweenFileSystems) {
     if (!test::MountedHome::canBe())
         GTEST_SKIP() << "skipped: only root may mount a home";
     for (const Fault& fault : faults) {
-        if (fault.kind != FaultKind::exit && fault.error != EACCES)
+        if (fault.error != EACCES)
             loopOverFaults("/dev/shm", Home::mounted, GetParam(), fault);
     }
 }

@@ -8,7 +8,7 @@
 #include <malloc.h>
 #include <new>
 
-#if defined(__has_feature)
+#ifdef __has_feature
 #if __has_feature(thread_sanitizer) || __has_feature(address_sanitizer)
 #define ZOR_OPERATOR_NEW_IS_TAKEN
 #endif
@@ -94,10 +94,6 @@ MemoryWatch::MemoryWatch() {
 
 std::size_t MemoryWatch::peakBytes() const {
     return static_cast<std::size_t>(peakOfLive);
-}
-
-std::size_t MemoryWatch::bytes() const {
-    return static_cast<std::size_t>(std::max<std::ptrdiff_t>(liveBytes, 0));
 }
 
 } // namespace zor::support

@@ -36,8 +36,6 @@ public:
     MemoryWatch();
     /// The most bytes that lived at one time since.
     [[nodiscard]] std::size_t peakBytes() const;
-    /// The bytes that live.
-    [[nodiscard]] std::size_t bytes() const;
 };
 
 } // namespace zor::support

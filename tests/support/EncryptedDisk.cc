@@ -1,28 +1,21 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "support/EncryptedDisk.h"
 
-#include "os/FileDescriptor.h"
+#include "support/Files.h"
 
-#include <cerrno>
 #include <cstdlib>
 #include <cstring>
-#include <fcntl.h>
 #include <filesystem>
 #include <linux/fscrypt.h>
 #include <sys/ioctl.h>
 #include <sys/mount.h>
 #include <unistd.h>
-#include <vector>
 
 namespace zor::support {
 
 namespace {
 
 constexpr std::size_t keyBytes = 64;
-
-platform::FileDescriptor openDirectory(const std::string& path) {
-    return platform::FileDescriptor(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-}
 
 std::string because(const char* what) {
     return std::string(what) + ": " + ::strerrordesc_np(errno);

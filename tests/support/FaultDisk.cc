@@ -4,24 +4,16 @@
 #include <cstring>
 #include <exception>
 #include <iterator>
-#include <sys/wait.h>
-#include <unistd.h>
 
 namespace zor::support {
 
 using platform::MutexLock;
 
 std::string Fault::describe() const {
-    std::string text = "fault point " + std::to_string(point) + " as ";
-    switch (kind) {
-    case FaultKind::stop:
-        return text + "a stop";
-    case FaultKind::exit:
-        return text + "an exit";
-    case FaultKind::error:
-        break;
-    }
-    return text + ::strerrorname_np(error) + (span == FaultSpan::once ? " once" : " from then on");
+    return "fault point " + std::to_string(point) + " as " +
+           (kind == FaultKind::stop
+                ? "a stop"
+                : ::strerrorname_np(error) + std::string(span == FaultSpan::once ? " once" : " from then on"));
 }
 
 void FaultDisk::arm(const Fault& fault) {
@@ -60,8 +52,6 @@ int FaultDisk::faultOf(const DiskCallInfo& info) {
         met_ = true;
         if (fault_.kind == FaultKind::error)
             return -fault_.error;
-        if (fault_.kind == FaultKind::exit)
-            ::_exit(exitStatus);
         stopped_ = true;
     }
     if (!stopped_)
@@ -103,24 +93,7 @@ std::string DiskCallInfo::describe() const {
 }
 
 std::string FaultOutcome::describe() const {
-    std::string text = fault.describe();
-    if (!met)
-        return text + " (not met)";
-    return call.empty() ? text : text + " at " + call;
-}
-
-std::string waitForFaultChild(pid_t child, bool& met) {
-    int status = 0;
-    while (child > 0 && ::waitpid(child, &status, 0) < 0) {
-        if (errno != EINTR)
-            return "waitpid failed";
-    }
-    if (child < 0)
-        return "fork failed";
-    if (WIFSIGNALED(status))
-        return "the child ended by signal " + std::to_string(WTERMSIG(status));
-    met = WEXITSTATUS(status) == FaultDisk::exitStatus;
-    return met || WEXITSTATUS(status) == 0 ? "" : "the child ended with " + std::to_string(WEXITSTATUS(status));
+    return fault.describe() + (met ? " at " + call : " (not met)");
 }
 
 } // namespace zor::support

@@ -24,8 +24,6 @@ enum class FaultKind {
     error,
     /// Throws ProcessStopped.
     stop,
-    /// Ends the process without any clean-up, with FaultDisk::exitStatus. For a forked child.
-    exit,
 };
 enum class FaultSpan { once, fromThenOn };
 
@@ -43,8 +41,6 @@ struct Fault {
 
 class FaultDisk final : public InterceptedDisk {
 public:
-    static constexpr int exitStatus = 86;
-
     using InterceptedDisk::InterceptedDisk;
 
     void arm(const Fault& fault);

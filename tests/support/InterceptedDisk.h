@@ -13,67 +13,64 @@ class InterceptedDisk : public platform::Disk {
 public:
     explicit InterceptedDisk(platform::Disk& inner) : inner_(inner) {}
 
-    int makeDirectory(int directory, const char* name, mode_t mode) override {
-        return pass({DiskCall::makeDirectory, name, directory},
-                    [&] { return inner_.makeDirectory(directory, name, mode); });
+    int makeDirectory(int at, const char* name, mode_t mode) override {
+        return pass(DiskCall::makeDirectory, name, at, [&] { return inner_.makeDirectory(at, name, mode); });
     }
-    int createFile(int directory, const char* name, mode_t mode) override {
-        return pass({DiskCall::createFile, name, directory}, [&] { return inner_.createFile(directory, name, mode); });
+    int createFile(int at, const char* name, mode_t mode) override {
+        return pass(DiskCall::createFile, name, at, [&] { return inner_.createFile(at, name, mode); });
     }
-    int makeSymbolicLink(const char* target, int directory, const char* name) override {
-        return pass({DiskCall::makeSymbolicLink, name, directory},
-                    [&] { return inner_.makeSymbolicLink(target, directory, name); });
+    int makeSymbolicLink(const char* target, int at, const char* name) override {
+        return pass(DiskCall::makeSymbolicLink, name, at, [&] { return inner_.makeSymbolicLink(target, at, name); });
     }
     int makeHardLink(int fromDirectory, const char* from, int toDirectory, const char* to) override {
-        return pass({DiskCall::makeHardLink, std::string(from) + " -> " + to, fromDirectory},
+        return pass(DiskCall::makeHardLink, std::string(from) + " -> " + to, fromDirectory,
                     [&] { return inner_.makeHardLink(fromDirectory, from, toDirectory, to); });
     }
-    int makeFifo(int directory, const char* name, mode_t mode) override {
-        return pass({DiskCall::makeFifo, name, directory}, [&] { return inner_.makeFifo(directory, name, mode); });
+    int makeFifo(int at, const char* name, mode_t mode) override {
+        return pass(DiskCall::makeFifo, name, at, [&] { return inner_.makeFifo(at, name, mode); });
     }
     int rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) override {
-        return pass({DiskCall::rename, std::string(from) + " -> " + to, fromDirectory},
+        return pass(DiskCall::rename, std::string(from) + " -> " + to, fromDirectory,
                     [&] { return inner_.rename(fromDirectory, from, toDirectory, to, flags); });
     }
-    int unlinkFile(int directory, const char* name) override {
-        return pass({DiskCall::unlinkFile, name, directory}, [&] { return inner_.unlinkFile(directory, name); });
+    int unlinkFile(int at, const char* name) override {
+        return pass(DiskCall::unlinkFile, name, at, [&] { return inner_.unlinkFile(at, name); });
     }
-    int removeDirectory(int directory, const char* name) override {
-        return pass({DiskCall::removeDirectory, name, directory},
-                    [&] { return inner_.removeDirectory(directory, name); });
+    int removeDirectory(int at, const char* name) override {
+        return pass(DiskCall::removeDirectory, name, at, [&] { return inner_.removeDirectory(at, name); });
     }
     int changeMode(int fd, mode_t mode) override {
-        return pass({DiskCall::changeMode, "", fd}, [&] { return inner_.changeMode(fd, mode); });
+        return pass(DiskCall::changeMode, "", fd, [&] { return inner_.changeMode(fd, mode); });
     }
     int changeOwner(int fd, uid_t uid, gid_t gid) override {
-        return pass({DiskCall::changeOwner, "", fd}, [&] { return inner_.changeOwner(fd, uid, gid); });
+        return pass(DiskCall::changeOwner, "", fd, [&] { return inner_.changeOwner(fd, uid, gid); });
     }
     int setTimes(int fd, const timespec& access, const timespec& modification) override {
-        return pass({DiskCall::setTimes, "", fd}, [&] { return inner_.setTimes(fd, access, modification); });
+        return pass(DiskCall::setTimes, "", fd, [&] { return inner_.setTimes(fd, access, modification); });
     }
     int setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) override {
-        return pass({DiskCall::setAttribute, name, fd}, [&] { return inner_.setAttribute(fd, name, value); });
+        return pass(DiskCall::setAttribute, name, fd, [&] { return inner_.setAttribute(fd, name, value); });
     }
     int setInodeFlags(int fd, int flags) override {
-        return pass({DiskCall::setInodeFlags, "", fd}, [&] { return inner_.setInodeFlags(fd, flags); });
+        return pass(DiskCall::setInodeFlags, "", fd, [&] { return inner_.setInodeFlags(fd, flags); });
     }
     int write(int fd, std::span<const std::uint8_t> bytes) override {
-        return pass({DiskCall::write, "", fd}, [&] { return inner_.write(fd, bytes); });
+        return pass(DiskCall::write, "", fd, [&] { return inner_.write(fd, bytes); });
     }
     int cloneData(int from, int to) override {
-        return pass({DiskCall::cloneData, "", from}, [&] { return inner_.cloneData(from, to); });
+        return pass(DiskCall::cloneData, "", from, [&] { return inner_.cloneData(from, to); });
     }
     ssize_t copyData(int from, int to, std::size_t bytesMax) override {
         return intercept({DiskCall::copyData, "", from}, [&] { return inner_.copyData(from, to, bytesMax); });
     }
     int sync(int fd) override {
-        return pass({DiskCall::sync, "", fd}, [&] { return inner_.sync(fd); });
+        return pass(DiskCall::sync, "", fd, [&] { return inner_.sync(fd); });
     }
     int syncFileSystem(int fd) override {
-        return pass({DiskCall::syncFileSystem, "", fd}, [&] { return inner_.syncFileSystem(fd); });
+        return pass(DiskCall::syncFileSystem, "", fd, [&] { return inner_.syncFileSystem(fd); });
     }
     int orderData(int fd) override {
-        return pass({DiskCall::orderData, "", fd}, [&] { return inner_.orderData(fd); });
+        return pass(DiskCall::orderData, "", fd, [&] { return inner_.orderData(fd); });
     }
     [[nodiscard]] ssize_t read(int fd, std::span<std::uint8_t> bytes) override { return inner_.read(fd, bytes); }
     [[nodiscard]] bool hidesNames(int directory) override { return inner_.hidesNames(directory); }
@@ -85,7 +82,9 @@ protected:
     [[nodiscard]] platform::Disk& inner() { return inner_; }
 
 private:
-    int pass(const DiskCallInfo& info, const Make& make) { return static_cast<int>(intercept(info, make)); }
+    int pass(DiskCall call, std::string subject, int fd, const Make& make) {
+        return static_cast<int>(intercept({call, std::move(subject), fd}, make));
+    }
 
     platform::Disk& inner_;
 };

@@ -1,11 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "support/ProcessResources.h"
 
-#include <cstdlib>
-#include <dirent.h>
 #include <filesystem>
 #include <iterator>
-#include <memory>
 #include <thread>
 #include <unistd.h>
 
@@ -15,15 +12,11 @@ namespace {
 
 std::map<int, std::string> openDescriptors() {
     std::map<int, std::string> found;
-    const std::unique_ptr<DIR, int (*)(DIR*)> stream(::opendir("/proc/self/fd"), ::closedir);
-    while (const dirent* entry = ::readdir(stream.get())) {
-        const int fd = std::atoi(entry->d_name);
-        if (entry->d_name[0] == '.' || fd == ::dirfd(stream.get()))
-            continue;
-        char target[4096];
-        const ssize_t length = ::readlinkat(::dirfd(stream.get()), entry->d_name, target, sizeof target);
-        found.emplace(fd, std::string(target, length < 0 ? 0 : static_cast<std::size_t>(length)));
-    }
+    std::error_code ignored;
+    for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd"))
+        found.emplace(std::stoi(entry.path().filename()), std::filesystem::read_symlink(entry, ignored));
+    // The listing's own.
+    std::erase_if(found, [](const auto& one) { return one.second == "/proc/" + std::to_string(::getpid()) + "/fd"; });
     return found;
 }
 

@@ -6,6 +6,7 @@
 #include "platform/PlatformLog.h"
 
 #include <algorithm>
+#include <atomic>
 #include <ostream>
 #include <string>
 #include <utility>
@@ -30,31 +31,19 @@ public:
     explicit RecordingLog(int level = 0) : level_(level) {}
 
     bool open(std::string_view, int level) override {
-        setLevel(level);
-        return true;
+        level_ = level;
+        return isOpen();
     }
-    [[nodiscard]] bool isOpen() const override {
-        const platform::MutexLock held(mutex_);
-        return level_ != 0;
-    }
-    [[nodiscard]] int level() const override {
-        const platform::MutexLock held(mutex_);
-        return level_;
-    }
+    [[nodiscard]] bool isOpen() const override { return level_ != 0; }
+    [[nodiscard]] int level() const override { return level_; }
     void enableDiskLogging(const std::string&, unsigned, std::size_t) override {}
     void write(int level, std::string_view function, std::string_view message) override {
         const platform::MutexLock held(mutex_);
         lines_.push_back({level, std::string(function), std::string(message)});
     }
-    void writeToSystemLog(int priority, std::string_view message) override {
-        const platform::MutexLock held(mutex_);
-        lines_.push_back({priority, "syslog", std::string(message)});
-    }
+    void writeToSystemLog(int priority, std::string_view message) override { write(priority, "syslog", message); }
 
-    void setLevel(int level) {
-        const platform::MutexLock held(mutex_);
-        level_ = level;
-    }
+    void setLevel(int level) { level_ = level; }
     /// The lines since the last call.
     std::vector<LogLine> take() {
         const platform::MutexLock held(mutex_);
@@ -70,8 +59,8 @@ public:
     }
 
 private:
-    mutable platform::Mutex mutex_;
-    int level_ ZOR_GUARDED_BY(mutex_);
+    std::atomic<int> level_;
+    platform::Mutex mutex_;
     std::vector<LogLine> lines_ ZOR_GUARDED_BY(mutex_);
 };
 
