@@ -110,6 +110,25 @@ TEST(TreeWalker, GoesUpOnlyIntoDirectoriesItCameFrom) {
     }
 }
 
+// A name that changes its kind between the reading of the directory and its turn is visited as what it is now.
+TEST(TreeWalker, VisitsWhatANameIsNow) {
+    World world;
+    makeItems(world.fd(), {"tree/", "tree/a/", "tree/b/"});
+    std::vector<WalkEntryKind> kinds;
+    TreeWalker walker;
+    walker.walk(world.fd(), "tree", [&](const WalkEntry& entry) {
+        if (entry.depth == 0)
+            return WalkStep::proceed;
+        const std::string other = entry.name == std::string("a") ? "tree/b" : "tree/a";
+        if (kinds.empty() && ::unlinkat(world.fd(), other.c_str(), AT_REMOVEDIR) == 0)
+            makeLink(world.fd(), other, "../outside");
+        kinds.push_back(entry.kind);
+        return WalkStep::proceed;
+    });
+    using enum WalkEntryKind;
+    EXPECT_EQ(kinds, (std::vector{directory, directoryEnd, symbolicLink}));
+}
+
 // Mount points, of another file system and of this one (a loop), and a mount on a file: shown, not entered.
 TEST(TreeWalker, DoesNotCrossMounts) {
     World world;

@@ -3,11 +3,8 @@
 #include "os/Names.h"
 #include "service/ListenerWorld.h"
 #include "service/SeqpacketUpcallPort.h"
-#include "support/ProcessResources.h"
 #include "support/TestRoot.h"
 
-#include <algorithm>
-#include <sys/socket.h>
 #include <sys/wait.h>
 
 namespace zor::platform {

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
-// Taking containers out of the store: what goes with each class, and owners who swap what is to be deleted. Death row:
-// what gets there, on which file system, what a pass does with it, and the races of the two.
+// Taking containers out of the store: what a batch stages and says, what goes with each class, owners who swap what is
+// to be deleted; and death row: what gets there, on which file system, what a pass does with it, and the races of the
+// two.
 #include "fs/Names.h"
 #include "store/ZOREntitlementMapping.h"
 #include "world/World.h"
@@ -18,11 +19,19 @@ using plist::Dictionary;
 using support::DiskCall;
 using support::DiskCallInfo;
 using support::FaultSpan;
+using Batch = ZORClientConnection::DeletionBatch;
 using Names = std::vector<std::string>;
 
 class Deletion : public testing::Test {
 protected:
     Deletion() { world.load(); }
+    static void add(Batch& batch, std::uint32_t user, std::optional<UUID> uuid, std::optional<std::string> identifier,
+                    std::expected<std::uint64_t, std::string> containerClass) {
+        batch.users.push_back(user);
+        batch.uuids.push_back(uuid);
+        batch.identifiers.push_back(std::move(identifier));
+        batch.classes.push_back(std::move(containerClass));
+    }
     /// A container's move to death row, whichever name it gets there.
     static bool isMoveOf(const FoundContainer& container, const DiskCallInfo& call) {
         return call.call == DiskCall::rename && call.subject.starts_with(nameOf(container.path) + " -> ");
@@ -30,6 +39,34 @@ protected:
 
     World world;
 };
+
+// Goal: bad elements are said and skipped, missing ones skipped, good ones go. Method: one batch of every kind.
+TEST_F(Deletion, AMixedBatch) {
+    const FoundContainer first = world.make("first");
+    const FoundContainer kept = world.make("kept");
+    const FoundContainer last = world.make("last", ContainerClass::sharedAppGroup);
+    const FoundContainer thrownAway = world.make("kept", application, asTransient);
+    Batch batch;
+    add(batch, mobile, first.uuid, "first", 2);
+    // These are said.
+    add(batch, mobile, kept.uuid, "kept", std::unexpected("\"2\""));
+    add(batch, mobile, std::nullopt, "kept", 2);
+    add(batch, mobile, kept.uuid, std::nullopt, 2);
+    add(batch, mobile, kept.uuid, "kept", ~std::uint64_t{0});
+    // And these not.
+    add(batch, second, kept.uuid, "kept", 2);
+    add(batch, mobile, kept.uuid, "first", 2);
+    add(batch, mobile, kept.uuid, "kept", 7);
+    add(batch, mobile, first.uuid, "first", 2); // gone by now
+    add(batch, mobile, thrownAway.uuid, "kept", 2);
+    add(batch, mobile, last.uuid, "last", 7);
+    EXPECT_TRUE(world.daemonsClient().stageForDeleteContainersWithUsers(batch, UseLocking::yes));
+    EXPECT_EQ(world.complaints("stageForDeleteContainersWithUsers").size(), 4U);
+    for (const FoundContainer& gone : {first, last, thrownAway})
+        EXPECT_TRUE(!isThere(gone.path) && world.exists(dead + "/" + nameOf(gone.path)));
+    EXPECT_EQ(world.names(dead).size(), 3U);
+    EXPECT_TRUE(world.make("kept").existed && !world.make("first").existed);
+}
 
 // Goal: what waits on death row is in nobody's way. Method: containers of one well-known name, deleted in a row.
 TEST_F(Deletion, EqualNamesDoNotCollide) {

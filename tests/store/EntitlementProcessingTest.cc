@@ -94,9 +94,11 @@ TEST_F(Processing, WhatAChangeReleases) {
         {"one of two", both, none, h, {"g"}},
         {"everything, as an empty dictionary", both, none, Dictionary{}, {"g", "h"}},
         {"another holds it", both, g, none, {"h"}},
+        {"another holds it among things that are none", both, mixed, none, {"h"}},
         {"another holds it as a string", both, text, none, {"h"}},
         {"listed twice", of(apps, Array{"g", "g"}), none, none, {}},
         {"its own string", text, none, none, {"g"}},
+        {"from a list to a string", g, none, text, {}},
         {"what is no list means none", g, none, mixed, {"g"}},
         {"the same name of another kind", of(apps, Array{"systemgroup.s"}), none, none, {}},
         {"a system group", s, none, h, {"systemgroup.s"}},
@@ -109,6 +111,7 @@ TEST_F(Processing, WhatAChangeReleases) {
         {"another holds it by the other key", s, byOtherKey, none, {}},
         {"without its prefix", of(groups, Array{"unprefixed"}), none, none, {}},
         {"a system container, 1", container, none, of(systemContainer, 1), {"a"}},
+        {"a system container kept", container, none, container, {}},
         {"a system container it never had", h, container, none, {"h"}},
     };
     for (const Row& row : rows) {

@@ -8,7 +8,9 @@
 #include <filesystem>
 #include <future>
 #include <gtest/gtest.h>
+#include <sys/wait.h>
 #include <thread>
+#include <unistd.h>
 
 namespace zor::test {
 namespace {
@@ -137,6 +139,19 @@ TEST_F(Known, ASizeIsNotKeptForWhatMovedMeanwhile) {
     EXPECT_TRUE(get(address, "com.veltra.Brevance.StaticDiskUsage"));
 }
 
+// Goal: the retry test ends the daemon as often as told, and leaves nothing. Method: a child a call.
+TEST_F(Known, RetryTestCountsDown) {
+    for (const bool crashes : {true, false}) {
+        const pid_t child = ::fork();
+        if (child == 0)
+            ::_exit(client().retryTestForUser(mobile, 1) ? 7 : 8);
+        int status = -1;
+        ::waitpid(child, &status, 0);
+        EXPECT_EQ(WIFEXITED(status) ? WEXITSTATUS(status) : 0, crashes ? 0 : 7);
+        EXPECT_EQ(world.names(applications).size(), crashes ? 1U : 0U);
+    }
+}
+
 // Goal: nobody waits for the disk under the lock of all identifiers. Method: whether somebody holds it at each sync
 // that an operation makes, on file systems that keep an order and on those that keep none.
 TEST(Syncs, AreWaitedForWithoutTheLock) {
@@ -219,7 +234,7 @@ TEST_F(Known, ASlowDirectoryKeepsNobodyElse) {
     EXPECT_EQ(cache.heldByUser(second).containers, 1U);
     // Its owner has moved it; a deletion and a creation beside it come to pass meanwhile.
     const FoundContainer another = world.make("another");
-    world.move(mine.path, parentOf(mine.path) + "/" + UUID::random().string());
+    ASSERT_EQ(::rename(mine.path.c_str(), (parentOf(mine.path) + "/" + UUID::random().string()).c_str()), 0);
     whileReading(
         [&] {
             EXPECT_TRUE(world.services().store().removal.stage(
