@@ -7,10 +7,10 @@ import sys
 import zorvane
 
 try:
-    with zorvane.Client(*sys.argv[1:2]) as client:
+    with zorvane.Client(sys.argv[1] if len(sys.argv) > 1 else "/") as client:
         notes = client.create(zorvane.DATA_APPLICATION, "org.example.notes")
-        starts = client.info(notes, "starts") or 0
-        starts += 1
+        stored = client.info(notes, "starts")
+        starts = (stored if isinstance(stored, int) else 0) + 1
         client.set_info(notes, "starts", starts)
         print(f"{notes.path}, start {starts}")
 except zorvane.Error as error:
