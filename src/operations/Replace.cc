@@ -2,14 +2,20 @@
 #include "operations/Replace.h"
 
 #include "base/BlockingScope.h"
+#include "fs/ItemStatus.h"
 #include "os/FileDescriptor.h"
+#include "store/ContainerLayout.h"
 #include "store/ReplaceJournal.h"
 #include "store/ZORWhitelist.h"
 
 #include <cerrno>
+#include <cstdio>
 #include <cstdlib>
 #include <iterator>
 #include <span>
+#include <sys/stat.h>
+#include <tuple>
+#include <utility>
 
 namespace zor {
 
@@ -29,6 +35,10 @@ struct Replace::Progress {
     /// The directory of which a move is to be on the disk before the journal can be gone; nullptr: none.
     const FileDescriptor* moved = nullptr;
     bool oldWaits = false; // in staging, and its journal with it, for a later try
+    bool swapped = false;  // the old one lies in the new one's place, and needs no journal
+    /// The containers themselves.
+    FileDescriptor oldOne;
+    FileDescriptor newOne;
     /// Opened before the first move, so that want of descriptors stops no replace half-way and leaves no journal of one
     /// that is done: a launch would take it for one to be undone as soon as the new container has gone.
     struct {
@@ -86,8 +96,8 @@ Result<void> Replace::checkedReplace(const ReplaceRequest& request, StartDeletio
     const auto& directories = progress.directories;
     const int dest = directories.dest.get();
     // A journal that came back with the power would undo what comes to the new one later.
-    const int synced =
-        needs_.moves.durability().afterMoves(dest, progress.oldRecord ? directories.journals.get() : dest);
+    const bool hasJournal = progress.oldRecord && !progress.swapped;
+    const int synced = needs_.moves.durability().afterMoves(dest, hasJournal ? directories.journals.get() : dest);
     if (synced < 0)
         return needs_.moves.notLasting(replaceFunction, ErrorCode::newNotMovedIntoPlace, progress.destUrl,
                                        posixError({replaceFunction, __LINE__}, -synced, "sync of %s failed: %s",
@@ -216,9 +226,13 @@ Result<void> Replace::moveOldAway(const ReplaceRequest& request, Progress& progr
     // Whoever owns them may have put something else, or another's directory, in their places.
     const std::uint32_t owner =
         ZORGlobalConfiguration::ownerOfClassDirectory(request.classNew, progress.newRecord->uid());
-    for (const FileURL* url : {&progress.oldUrl, &progress.newUrl})
-        if (const auto opened = needs_.fileManager.openDirectoryOf(owner, *url); !opened)
+    for (const auto& [url, directory] :
+         {std::pair(&progress.oldUrl, &progress.oldOne), std::pair(&progress.newUrl, &progress.newOne)}) {
+        auto opened = needs_.fileManager.openDirectoryOf(owner, *url);
+        if (!opened)
             return oldNotMoved(opened.error());
+        *directory = std::move(*opened);
+    }
     if (const auto opened = openDirectories(progress, stagingUrl); !opened)
         return oldNotMoved(opened.error());
     if (request.preserveOldUuid == PreserveOldUUID::yes) {
@@ -226,6 +240,11 @@ Result<void> Replace::moveOldAway(const ReplaceRequest& request, Progress& progr
         progress.newRecord->setUuid(progress.oldRecord->uuid());
         TRY(progress.newRecord->writeMetadataToDiskWithError(log, needs_.fileManager));
     }
+    const auto swapped = changePlaces(progress);
+    if (!swapped)
+        return oldNotMoved(swapped.error());
+    if (*swapped)
+        return forgetOld(request, progress);
     const FileURL journalUrl = ReplaceJournal::urlFor(needs_.configuration.replaceDirectory(), journalUuid);
     progress.stagingUrl = stagingUrl;
     const ReplaceJournal journal{.oldUrl = progress.oldUrl,
@@ -249,20 +268,69 @@ Result<void> Replace::moveOldAway(const ReplaceRequest& request, Progress& progr
     // A copy does not fail when only the source cannot go: two would be live.
     if (*moved == ZORFileManager::Moved::byCopy && !needs_.fileManager.itemDoesNotExistAtURL(progress.oldUrl))
         return oldNotMoved(posixError(here, EBUSY, "%s is still there", progress.oldUrl.c_str()));
+    // In staging nobody else can put another in its place.
+    if (*moved == ZORFileManager::Moved::byName)
+        if (const auto meant = judgeMoved(directories.staging.get(), progress.stagingUrl, progress.oldOne); !meant)
+            return undoFirstMove(progress, meant.error());
     progress.moved = &directories.dest;
     // A cut could leave the second of two moves without the first, with nothing else to keep their order.
     if (const int ordered = needs_.moves.durability().between(directories.staging.get(), directories.dest.get());
         ordered < 0)
         return undoFirstMove(
             progress, posixError(here, -ordered, "sync of %s failed: %s", stagingUrl.c_str(), errorText(-ordered)));
+    return forgetOld(request, progress);
+}
+
+Result<void> Replace::forgetOld(const ReplaceRequest& request, const Progress& progress) {
     const bool transient = progress.oldWasTransient;
     const auto removed = needs_.cache.removeContainerForUser(request.userIdOld, request.classOld,
                                                              &progress.oldRecord->identifier(), transient);
     if (!removed)
-        return makeError(log, here, ErrorCode::cacheRemoveFailed, &removed.error(), LogFlag::yes,
-                         "Failed to remove from cache id: %s, class: %ld, transient: %d",
+        return makeError(needs_.log, {replaceFunction, __LINE__}, ErrorCode::cacheRemoveFailed, &removed.error(),
+                         LogFlag::yes, "Failed to remove from cache id: %s, class: %ld, transient: %d",
                          ZOR_SHOWN(progress.oldRecord->identifier()), static_cast<long>(request.classOld), transient);
     return {};
+}
+
+Result<void> Replace::judgeMoved(int directory, const FileURL& url, const FileDescriptor& moved) {
+    struct stat named{};
+    struct stat meant{};
+    const int failure = fs::statusOfName(directory, std::string(url.lastPathComponent()).c_str(), named);
+    if (failure == 0 && ::fstat(moved.get(), &meant) == 0 && named.st_dev == meant.st_dev &&
+        named.st_ino == meant.st_ino)
+        return {};
+    return posixError({replaceFunction, __LINE__}, failure != 0 ? failure : ESTALE,
+                      "what came to %s is not the container", url.c_str());
+}
+
+Result<bool> Replace::changePlaces(Progress& progress) {
+    const auto& directories = progress.directories;
+    struct stat old{};
+    struct stat staging{};
+    // A live new one, or a transient old one, would leave two of one kind after a stop.
+    if (progress.oldWasTransient || !progress.newRecord->transient() || ::fstat(directories.old.get(), &old) != 0 ||
+        ::fstat(directories.staging.get(), &staging) != 0 || old.st_dev == staging.st_dev)
+        return false;
+    const auto exchange = [&] {
+        return needs_.fileManager.disk().rename(
+            directories.old.get(), std::string(progress.oldUrl.lastPathComponent()).c_str(), directories.fresh.get(),
+            std::string(progress.newUrl.lastPathComponent()).c_str(), RENAME_EXCHANGE);
+    };
+    const int exchanged = exchange();
+    if (exchanged == -EXDEV || exchanged == -EINVAL || exchanged == -ENOSYS || exchanged == -EOPNOTSUPP)
+        return false; // a file system that cannot
+    if (exchanged < 0)
+        return posixError({replaceFunction, __LINE__}, -exchanged, "exchange of %s and %s failed: %s",
+                          progress.oldUrl.c_str(), progress.newUrl.c_str(), errorText(-exchanged));
+    for (const auto& [directory, url, one] : {std::tuple(&directories.old, &progress.oldUrl, &progress.newOne),
+                                              std::tuple(&directories.fresh, &progress.newUrl, &progress.oldOne)})
+        if (auto meant = judgeMoved(directory->get(), *url, *one); !meant) {
+            (void)exchange(); // their owner did it
+            return std::move(meant).error();
+        }
+    progress.swapped = true;
+    progress.newUuidBefore.reset();
+    return true;
 }
 
 ZORError Replace::undoFirstMove(Progress& progress, const ZORError& cause) {
@@ -309,9 +377,7 @@ Result<void> Replace::putNewInPlace(const ReplaceRequest& request, Progress& pro
     const Log& log = needs_.log;
     const Here here{replaceFunction, __LINE__};
     ZORMetadata& record = *progress.newRecord;
-    const auto moved = needs_.fileManager.moveItem(progress.directories.fresh.get(), progress.newUrl,
-                                                   progress.directories.dest.get(), progress.destUrl);
-    if (!moved)
+    if (const auto moved = moveNew(progress); !moved)
         return notInPlace(progress, moved.error());
     progress.newUuidBefore.reset(); // the old UUID is its own from now on
     record.setDurable(false);
@@ -345,8 +411,30 @@ Result<void> Replace::putNewInPlace(const ReplaceRequest& request, Progress& pro
     return {};
 }
 
+Result<void> Replace::moveNew(Progress& progress) {
+    const auto& directories = progress.directories;
+    if (!progress.swapped) {
+        TRY(needs_.fileManager.moveItem(directories.fresh.get(), progress.newUrl, directories.dest.get(),
+                                        progress.destUrl));
+        return {};
+    }
+    if (progress.destUrl == progress.oldUrl)
+        return {};
+    const auto renamed =
+        needs_.fileManager.renameItem(directories.old.get(), progress.oldUrl, directories.dest.get(), progress.destUrl);
+    // It is a container whole and live under either name.
+    if (!renamed) {
+        needs_.log.write(logLevelError, replaceFunction, "%s keeps the directory name of the one that it replaced: %s",
+                         progress.oldUrl.c_str(), renamed.error().text().c_str());
+        progress.destUrl = progress.oldUrl;
+    }
+    return {};
+}
+
 void Replace::recoverFromException(const Progress& progress) {
     ZORFileManager& fileManager = needs_.fileManager;
+    if (progress.swapped)
+        needs_.cache.dropAll(); // it may know some of what has happened, and the disk knows all
     if (progress.oldUrl.empty() || progress.destUrl.empty() || !fileManager.itemDoesNotExistAtURL(progress.oldUrl) ||
         !fileManager.itemDoesNotExistAtURL(progress.destUrl))
         return;
@@ -373,6 +461,15 @@ std::optional<ZORError> Replace::cleanUpReplace(Progress& progress, StartDeletio
         // it.
         progress.newRecord->setUuid(*progress.newUuidBefore);
         (void)progress.newRecord->writeMetadataToDiskWithError(needs_.log, needs_.fileManager);
+    }
+    if (progress.swapped) {
+        const auto moved = needs_.deathRow._moveItemAtURLToDeathRow(
+            progress.newUrl, startDeletionThread,
+            topLevelOwnerOf(progress.newRecord->containerClass(), progress.newRecord->uid()));
+        if (moved)
+            return std::nullopt;
+        return makeError(needs_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
+                         LogFlag::yes, "Failed to remove staging dir: %s", progress.newUrl.c_str());
     }
     if (!progress.oldRecord || progress.journalUrl.empty())
         return std::nullopt;

@@ -8,6 +8,14 @@
 //   4. the new one moves to its destination                            stopped: done; staging is swept
 //   5. what waits in staging goes to death row, then the journal       stopped: done; the journal goes
 //
+// An old one on another file system than staging would have to be copied there and back, for nothing. Where the new one
+// is a transient one beside it, both change places in one step instead, which needs no journal:
+//   1. as above                                                        stopped: a transient one is discarded
+//   2. the two change places                                           stopped: done, under the old one's directory
+//   name
+//   3. the new one gets its own name, unless the UUID is preserved     stopped: done
+//   4. the old one, a transient one by its place, goes to death row    stopped: a transient one is discarded
+//
 // A power cut leaves the same states: the journal is synced before the first move, the moves keep their order (where
 // the file system does not see to that, syncs do), and they are on the disk before the journal goes and the client
 // hears.
@@ -31,6 +39,7 @@
 #include "operations/LastingMoves.h"
 #include "operations/ReplaceRecovery.h"
 #include "operations/SandboxMappings.h"
+#include "os/FileDescriptor.h"
 #include "store/ZORContainerCache.h"
 #include "store/ZORGlobalConfiguration.h"
 #include "store/ZORWhitelist.h"
@@ -86,6 +95,14 @@ private:
     Result<void> prepareReplace(const ReplaceRequest& request, Progress& progress, const AllIdentifiersWriteLock& lock);
     Result<void> refuseSecondOfIdentifier(const Progress& progress);
     Result<void> moveOldAway(const ReplaceRequest& request, Progress& progress);
+    /// Whether the old and the new one have changed places; false where that cannot be.
+    Result<bool> changePlaces(Progress& progress);
+    /// The new one's move to its destination.
+    Result<void> moveNew(Progress& progress);
+    /// Error ESTALE when that did not come where it was to come to.
+    Result<void> judgeMoved(int directory, const FileURL& url, const platform::FileDescriptor& moved);
+    /// The step of moveOldAway that all ways have last.
+    Result<void> forgetOld(const ReplaceRequest& request, const Progress& progress);
     Result<void> putNewInPlace(const ReplaceRequest& request, Progress& progress);
     Result<void> openDirectories(Progress& progress, const FileURL& stagingUrl);
     /// Error 14, or 35 when the old one waits in staging.

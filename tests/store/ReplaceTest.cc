@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <array>
+#include <fcntl.h>
 #include <filesystem>
 #include <gtest/gtest.h>
 #include <map>
@@ -256,6 +257,60 @@ TEST_F(ReplaceWithoutOrder, ASyncThatFailsLosesNothing) {
         }
     EXPECT_GT(undone, 2);
     EXPECT_GT(waited, 0);
+}
+
+// Goal: with the home on another file system nothing is copied to get out of the way, whatever its owner does
+// meanwhile; where two names cannot be exchanged the replace succeeds all the same. Method: an old one with what no
+// copy can make; an exchange, and the move after it, that are refused; an owner who swaps before the exchange.
+TEST(ReplaceAtHome, ChangesPlaces) {
+    enum class Row { plain, cannotExchange, cannotRename, swapped };
+    if (!MountedHome::canBe())
+        GTEST_SKIP() << "skipped: only root may mount a home";
+    for (const Row row : {Row::plain, Row::cannotExchange, Row::cannotRename, Row::swapped})
+        for (const Preserve preserve : {Preserve::no, Preserve::yes}) {
+            SCOPED_TRACE(std::to_string(static_cast<int>(row)) + (preserve == Preserve::yes ? " preserving" : ""));
+            World world;
+            const MountedHome home(world.path());
+            ASSERT_TRUE(home.mounted());
+            const FoundContainer old = world.make("id");
+            const FoundContainer fresh = world.make("id", application, asTransient);
+            const FoundContainer decoy = world.make("decoy");
+            const auto contentAt = [&](const std::string& path) {
+                return world.read(world.relative(path) + "/content");
+            };
+            world.write(world.relative(old.path) + "/content", "old");
+            world.write(world.relative(fresh.path) + "/content", "new");
+            ASSERT_TRUE(row == Row::cannotExchange || ::mknod((old.path + "/whiteout").c_str(), S_IFCHR, 0) == 0);
+            int moves = 0;
+            world.disk().arm({.error = EINVAL, .span = FaultSpan::fromThenOn, .filter = [&](const DiskCallInfo& call) {
+                                  if (call.subject != nameOf(old.path) + " -> " + nameOf(fresh.path))
+                                      return false;
+                                  ++moves;
+                                  EXPECT_TRUE(row != Row::swapped || moves != 1 ||
+                                              ::renameat2(AT_FDCWD, old.path.c_str(), AT_FDCWD, decoy.path.c_str(),
+                                                          RENAME_EXCHANGE) == 0);
+                                  return (row == Row::cannotExchange && moves == 1) ||
+                                         (row == Row::cannotRename && moves == 2);
+                              }});
+            const auto replaced = world.replace(&old, fresh, preserve);
+            world.disk().disarm();
+            EXPECT_EQ(codeOf(replaced), row == Row::swapped ? ErrorCode::oldNotMovedToStaging : ErrorCode::success);
+            if (row == Row::swapped) {
+                EXPECT_EQ(contentAt(fresh.path), "new");
+                EXPECT_EQ(contentAt(decoy.path), "old");
+                EXPECT_EQ(world.find("id", application, asTransient).error().code(), 21);
+            }
+            for (int launch = 0; row != Row::swapped && launch < 2; ++launch) {
+                const auto found = world.find("id");
+                ASSERT_TRUE(found);
+                EXPECT_EQ(found->uuid, preserve == Preserve::yes ? old.uuid : fresh.uuid);
+                EXPECT_EQ(found->path == old.path, preserve == Preserve::yes || row == Row::cannotRename);
+                EXPECT_EQ(contentAt(found->path), "new");
+                EXPECT_FALSE(isThere(fresh.path));
+                world.restart();
+            }
+            EXPECT_TRUE(world.names(staging).empty() && world.names(journals).empty());
+        }
 }
 
 // Goal: a wipe keeps path and UUID and leaves a new one's content. Method: a table of clients and classes, a restart.

@@ -93,6 +93,8 @@ void apply(const LoggedOperation& operation, FileTree& tree) {
     const auto entriesOf = [&](InodeId id) -> std::map<std::string, InodeId>& { return tree.inodes.at(id).entries; };
     if (operation.call == DiskCall::rename) {
         entriesOf(operation.directory).erase(operation.name);
+        if (operation.exchanges)
+            entriesOf(operation.directory)[operation.name] = operation.replaced;
         entriesOf(operation.toDirectory)[operation.toName] = operation.inode;
     } else if (operation.call == DiskCall::unlinkFile || operation.call == DiskCall::removeDirectory) {
         entriesOf(operation.directory).erase(operation.name);
@@ -288,7 +290,8 @@ int RecordingDisk::rename(int fromDirectory, const char* from, int toDirectory, 
          .name = source.name,
          .toDirectory = destination.directory,
          .toName = destination.name,
-         .replaced = findEntry(destination.directory, destination.name)});
+         .replaced = findEntry(destination.directory, destination.name),
+         .exchanges = (flags & RENAME_EXCHANGE) != 0});
     return result;
 }
 

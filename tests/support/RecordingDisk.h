@@ -14,8 +14,8 @@
 namespace zor::support {
 
 /// A write that fails after some bytes is logged with those; copyData is logged as a write of what it brought. setTimes
-/// and setInodeFlags are not modelled and not logged; neither are clones and exchanges of names, which no recorded
-/// operation makes and complaint() would tell.
+/// and setInodeFlags are not modelled and not logged; neither are clones, which no recorded operation makes
+/// and complaint() would tell.
 struct LoggedOperation {
     DiskCall call = DiskCall::sync;
     /// Made, linked, moved, removed, changed, written or synced; 0 for syncFileSystem.
@@ -28,8 +28,9 @@ struct LoggedOperation {
     /// A rename's destination.
     InodeId toDirectory = 0;
     std::string toName;
-    /// What a rename replaced.
+    /// What a rename replaced, or exchanged it with.
     InodeId replaced = 0;
+    bool exchanges = false;
     /// The state given to a new inode; the mode or the owner that a change sets; the bytes of a write.
     Inode value;
     std::uint64_t offset = 0;
