@@ -123,19 +123,24 @@ MountFence::Answered MountFence::Judgement::ask() {
     return {};
 }
 
-bool MountFence::answers() {
+bool MountFence::answers(Asked asked) {
     if (kind_ != Kind::home)
         return true;
     {
         const MutexLock held(judgement_->mutex);
+        const auto age = std::chrono::steady_clock::now() - judgement_->answeredAt;
         if (judgement_->kind == MountKind::local || judgement_->kind == MountKind::usersOwn ||
-            std::chrono::steady_clock::now() - judgement_->answeredAt < homeAnswerHolds)
+            (asked == Asked::lately && age < homeAnswerHolds))
             return true;
         // The question may outlive this object, and whoever made it.
         if (!judgement_->ownRoot.valid())
             judgement_->ownRoot.reset(::fcntl(judgement_->root, F_DUPFD_CLOEXEC, 0));
     }
-    return question_.ask([judgement = judgement_] { return judgement->ask(); }, homePatience).has_value();
+    if (question_.ask([judgement = judgement_] { return judgement->ask(); }, homePatience))
+        return true;
+    const MutexLock held(judgement_->mutex);
+    judgement_->answeredAt = {}; // what it answered before holds no more
+    return false;
 }
 
 OpenResult MountFence::openOwn(const char* path, std::size_t ownBytes) {

@@ -7,8 +7,8 @@
 // mount. That of a home is judged whenever it is another than before: a file system that a user serves (FUSE) is no
 // home, EXDEV; one that is not of this machine may stop answering. Such a home is asked on a thread of its own whether
 // it still answers, at most once in `answerHoldsMilliseconds`, and while it does not, all that leads there fails
-// with EHOSTDOWN at once. Not defended: a home that stops answering within that time holds the thread that is
-// there.
+// with EHOSTDOWN at once. Who is about to take a lock that others need asks anew. Not defended: a home that stops
+// answering between the question and the use holds the thread that is there.
 //
 // Changes nothing on the disk. Any thread; fences are added, never taken away.
 #pragma once
@@ -63,7 +63,8 @@ public:
     [[nodiscard]] std::size_t ownBytes(std::string_view path) const;
 
     /// Whether the home answers; false after `homePatience` at the latest. Costs nothing for a home on a local disk.
-    [[nodiscard]] bool answers();
+    enum class Asked { lately, now };
+    [[nodiscard]] bool answers(Asked asked = Asked::lately);
     /// Opens what lies at a path that the fence holds. EXDEV where that is, or lies behind, a mount point; EHOSTDOWN.
     [[nodiscard]] OpenResult open(const char* path, int flags);
     /// lstat: 0 or an errno, as above.

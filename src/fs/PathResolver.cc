@@ -41,10 +41,10 @@ void PathResolver::fence(const FileURL& url, MountFence::Kind kind) const {
         fences_.add(path, kind);
 }
 
-bool PathResolver::answers(const FileURL& url) const {
+bool PathResolver::answers(const FileURL& url, MountFence::Asked asked) const {
     const char* const path = relative(url);
     MountFence* const fence = path ? fences_.around(path) : nullptr;
-    const bool answered = !fence || fence->answers();
+    const bool answered = !fence || fence->answers(asked);
     if (!answered)
         noteLeft(url, EHOSTDOWN);
     return answered;

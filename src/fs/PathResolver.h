@@ -55,7 +55,7 @@ public:
     /// From now on no mount is crossed below this directory (see MountFence::Kind).
     void fence(const FileURL& url, MountFence::Kind kind) const;
     /// Whether the home that holds the item answers; see MountFence::answers.
-    [[nodiscard]] bool answers(const FileURL& url) const;
+    [[nodiscard]] bool answers(const FileURL& url, MountFence::Asked asked = MountFence::Asked::lately) const;
 
     /// For reading its entries and for acting on it.
     [[nodiscard]] OpenResult openDirectory(const FileURL& url) const;

@@ -27,6 +27,7 @@ Result<std::vector<ListedContainer>> Listing::containersForUser(std::uint32_t us
                                                                 bool transient) {
     return needs_.boundary.run(ZOR_HERE, [&]() -> Result<std::vector<ListedContainer>> {
         TRY(checkListedClass(userId, containerClass));
+        needs_.cache.prepare(userId, containerClass, transient);
         const AllIdentifiersLock lock(needs_.locks, LockMode::reading);
         return listed(TRY(needs_.cache.allContainersForUser(userId, containerClass, transient)));
     });
@@ -36,6 +37,7 @@ Result<ListedPage> Listing::containersForUser(std::uint32_t userId, ContainerCla
                                               const std::string& after) {
     return needs_.boundary.run(ZOR_HERE, [&]() -> Result<ListedPage> {
         TRY(checkListedClass(userId, containerClass));
+        needs_.cache.prepare(userId, containerClass, transient);
         const AllIdentifiersLock lock(needs_.locks, LockMode::reading);
         auto page = TRY(needs_.cache.pageOfContainersForUser(userId, containerClass, transient,
                                                              {after, needs_.limits.listPageMax}));

@@ -11,6 +11,7 @@ std::optional<ZORContainerCache::LiveContainer> lookUpUndisturbed(ZORLocks& lock
         if (locks.quietGeneration() == before)
             return live;
     }
+    cache.prepare(userId, containerClass, false);
     // A reader counts as no disturbance: lookups that meet a writer do not slow one another down when it is done.
     const AllIdentifiersLock lock(locks, LockMode::reading);
     return cache.liveContainerForUser(userId, containerClass, identifier);

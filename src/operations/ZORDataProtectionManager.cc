@@ -114,6 +114,7 @@ Result<std::shared_ptr<const ZORMetadata>> ZORDataProtectionManager::containerOf
         return makeError(needs_.log, {function, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
                          "Can't act on an invalid object: userId: %u, ID: %s, class: %ld", request.userId,
                          ZOR_SHOWN(request.identifier), static_cast<long>(request.containerClass));
+    needs_.cache.prepare(request.userId, request.containerClass, false);
     // Records are shared: what this change goes by is copied while nobody can change it.
     const AllIdentifiersLock lock(needs_.locks, LockMode::reading);
     const auto record =

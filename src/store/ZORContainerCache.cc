@@ -148,8 +148,11 @@ void ZORContainerCache::prepare(std::uint32_t userId, ContainerClass containerCl
         return;
     (void)boundary_.run(ZOR_HERE, [&]() -> Result<void> {
         const Key key{userId, containerClass, transient};
-        if (UserHome* const home = homeOf(key))
-            (void)home->lookIfDue();
+        UserHome* const home = homeOf(key);
+        if (home && !configuration_.homeAnswers(userId, fs::MountFence::Asked::now)) {
+            (void)home->look(); // who asks under the lock finds all questions asked
+            return {};
+        }
         const MutexLock held(cacheLock_);
         (void)_getCacheForUserId(key);
         return {};

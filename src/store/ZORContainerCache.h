@@ -87,8 +87,9 @@ public:
     Result<void> removeContainerForUser(std::uint32_t userId, ContainerClass containerClass,
                                         const std::string* identifier, bool transient);
 
-    /// Reads what a lookup will need, where that has not been done. For who takes the all-identifiers lock next, so
-    /// that nobody waits there for this disk. What fails is told by the lookup.
+    /// Reads what a lookup will need, where that has not been done, and asks a home that may stop answering whether it
+    /// does. For who takes the all-identifiers lock next, so that nobody waits there for this disk. What fails is told
+    /// by the lookup, at once.
     void prepare(std::uint32_t userId, ContainerClass containerClass, bool transient) ZOR_EXCLUDES(cacheLock_);
     /// The same for a lookup by UUID: of transient containers only where there may be some.
     void prepare(std::uint32_t userId, ContainerClass containerClass) ZOR_EXCLUDES(cacheLock_);

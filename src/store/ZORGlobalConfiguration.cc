@@ -67,10 +67,10 @@ void ZORGlobalConfiguration::fenceHomes() {
         (void)home->look();
 }
 
-bool ZORGlobalConfiguration::homeAnswers(std::uint32_t userId) {
+bool ZORGlobalConfiguration::homeAnswers(std::uint32_t userId, fs::MountFence::Asked asked) {
     UserHome* const home = homeOf(userId);
     const auto directory = home ? home->lookIfDue().directory : nullptr;
-    return !directory || fileManager_.resolver().answers(*directory);
+    return !directory || fileManager_.resolver().answers(*directory, asked);
 }
 
 FileURL ZORGlobalConfiguration::sharedContainersDirectory() {

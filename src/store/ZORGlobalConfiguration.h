@@ -48,7 +48,7 @@ public:
     /// False when the file system of a mobile user's home does not answer, after `fs::homePatience` at the latest. Who
     /// is about to take a lock that others need asks first; for a home on a local disk that costs nothing. True for
     /// everybody else.
-    [[nodiscard]] bool homeAnswers(std::uint32_t userId);
+    [[nodiscard]] bool homeAnswers(std::uint32_t userId, fs::MountFence::Asked asked = fs::MountFence::Asked::lately);
 
     FileURL sharedContainersDirectory();
     FileURL logDirectory();

@@ -1,10 +1,16 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "support/HangingFileSystem.h"
 
+#include <array>
+#include <cerrno>
 #include <cstdio>
+#include <cstring>
 #include <fcntl.h>
+#include <linux/fuse.h>
+#include <poll.h>
 #include <sys/mount.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 namespace zor::support {
 
@@ -19,7 +25,51 @@ HangingFileSystem::HangingFileSystem(std::string at, uid_t server)
     mounted_ = ::mount("hanging", at_.c_str(), "fuse", MS_NOSUID | MS_NODEV, options) == 0;
 }
 
+void HangingFileSystem::answer(uid_t owner) {
+    answering_ = std::jthread([device = device_.get(), owner](const std::stop_token& stop) {
+        std::array<char, std::size_t{1} << 18> bytes;
+        while (!stop.stop_requested()) {
+            pollfd waiting{.fd = device, .events = POLLIN, .revents = 0};
+            fuse_in_header asked{};
+            if (::poll(&waiting, 1, 1) != 1 ||
+                ::read(device, bytes.data(), bytes.size()) < static_cast<ssize_t>(sizeof asked))
+                continue;
+            std::memcpy(&asked, bytes.data(), sizeof asked);
+            if (asked.opcode == FUSE_FORGET || asked.opcode == FUSE_BATCH_FORGET)
+                continue;
+            struct {
+                fuse_out_header header{};
+                union {
+                    fuse_init_out init;
+                    fuse_attr_out attributes;
+                } body{};
+            } reply;
+            reply.header.unique = asked.unique;
+            std::size_t bodyBytes = 0;
+            if (asked.opcode == FUSE_INIT) {
+                reply.body.init = {};
+                reply.body.init.major = FUSE_KERNEL_VERSION;
+                reply.body.init.minor = FUSE_KERNEL_MINOR_VERSION;
+                reply.body.init.max_write = 4096;
+                bodyBytes = sizeof reply.body.init;
+            } else if (asked.opcode == FUSE_GETATTR) {
+                reply.body.attributes = {};
+                reply.body.attributes.attr.ino = asked.nodeid;
+                reply.body.attributes.attr.mode = S_IFDIR | 0755;
+                reply.body.attributes.attr.nlink = 2;
+                reply.body.attributes.attr.uid = reply.body.attributes.attr.gid = owner;
+                bodyBytes = sizeof reply.body.attributes;
+            } else {
+                reply.header.error = asked.opcode == FUSE_LOOKUP ? -ENOENT : -ENOSYS;
+            }
+            reply.header.len = static_cast<std::uint32_t>(sizeof reply.header + bodyBytes);
+            (void)!::write(device, &reply, reply.header.len);
+        }
+    });
+}
+
 HangingFileSystem::~HangingFileSystem() {
+    fallSilent();
     device_.reset();
     if (mounted_)
         ::umount2(at_.c_str(), MNT_DETACH);

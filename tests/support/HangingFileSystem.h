@@ -1,11 +1,13 @@
 // SPDX-License-Identifier: Apache-2.0
-// A file system (FUSE) that its server never answers for, as any user may mount one where fusermount lets him.
+// A file system (FUSE) that its server never answers for, as any user may mount one where fusermount lets him; or not
+// from some moment on.
 #pragma once
 
 #include "os/FileDescriptor.h"
 
 #include <string>
 #include <sys/types.h>
+#include <thread>
 
 namespace zor::support {
 
@@ -21,10 +23,15 @@ public:
     /// False where such mounts are not permitted.
     [[nodiscard]] bool mounted() const { return mounted_; }
 
+    /// From here on it is an empty directory of `owner`'s in which nothing can be made, until it falls silent.
+    void answer(uid_t owner);
+    void fallSilent() { answering_ = {}; }
+
 private:
     const std::string at_;
     platform::FileDescriptor device_;
     bool mounted_ = false;
+    std::jthread answering_;
 };
 
 } // namespace zor::support

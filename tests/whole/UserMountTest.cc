@@ -122,6 +122,34 @@ TEST(UserMount, KeepsNobodyWaiting) {
     }
 }
 
+// Goal: a home that is served over a network and falls silent keeps nobody else, also right after it has answered.
+// Method: a mount that answers until it has answered a request; then requests for it beside those of another user.
+TEST(UserMount, AHomeThatFallsSilent) {
+    DaemonProcess daemon;
+    daemon.start();
+    ASSERT_TRUE(serves(daemon, second));
+    support::HangingFileSystem home(daemon.path("private/var/mobile"), 0);
+    if (!home.mounted())
+        GTEST_SKIP() << "file systems of users (FUSE) cannot be mounted here";
+    home.answer(mobile);
+    const auto asks = [&] {
+        return isAnswered(daemon, [](auto& client) { return come(client.createOrLookup(dataContainer("new"))); });
+    };
+    EXPECT_LT(secondsOf([&] { EXPECT_TRUE(asks()); }), 1);
+    home.fallSilent();
+    std::jthread asking([&] { EXPECT_TRUE(asks()); });
+    auto client = daemon.client();
+    auto another = dataContainer("another"); // made, which takes the lock
+    another.user = second;
+    for (int i = 0; i < 40; ++i) {
+        another.identifier = "another" + std::to_string(i);
+        EXPECT_LT(secondsOf([&] { EXPECT_TRUE(client.createOrLookup(another)); }), 1);
+        std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    }
+    asking.join();
+    EXPECT_LT(secondsOf([&] { EXPECT_EQ(daemon.terminate(), 0); }), patienceSeconds);
+}
+
 // Goal: a request that waits for ever, for a file system that only the system mounts, does not keep the daemon from
 // ending. Method: a mount whose server is silent in the place of a class of the system's, and a request for it.
 TEST(SystemMount, KeepsNoEndWaiting) {
