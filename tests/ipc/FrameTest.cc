@@ -1,6 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "ipc/Frame.h"
-#include "ipc/ContainerClasses.h"
 #include "ipc/Keys.h"
 #include "ipc/Uuid.h"
 
@@ -24,28 +23,26 @@ TEST(Frame, HeaderBytes) {
 
 // Each side takes exactly what the other may send: lengths and flags around every limit.
 TEST(Frame, WhatEachSideTakes) {
-    struct Row {
+    const struct {
         std::uint32_t payloadBytes;
         std::uint32_t flags;
         bool request;
         bool reply;
-    };
-    for (const Row& row : std::initializer_list<Row>{
-             {0, 0, false, false},
-             {0, 2, false, false},
-             {1, 0, true, false},
-             {1, 1, true, false},
-             {1, 2, false, true},
-             {1, 3, false, false},
-             {1, 4, false, false},
-             {1, 6, false, false},
-             {1, 0x8000'0000, false, false},
-             {1'048'576, 1, true, false},
-             {1'048'577, 1, false, false},
-             {1'048'577, 2, false, true},
-             {0xFFFF'FFFF, 1, false, false},
-             {0xFFFF'FFFF, 2, false, true},
-         }) {
+    } rows[] = {{0, 0, false, false},
+                {0, 2, false, false},
+                {1, 0, true, false},
+                {1, 1, true, false},
+                {1, 2, false, true},
+                {1, 3, false, false},
+                {1, 4, false, false},
+                {1, 6, false, false},
+                {1, 0x8000'0000, false, false},
+                {1'048'576, 1, true, false},
+                {1'048'577, 1, false, false},
+                {1'048'577, 2, false, true},
+                {0xFFFF'FFFF, 1, false, false},
+                {0xFFFF'FFFF, 2, false, true}};
+    for (const auto& row : rows) {
         const FrameHeader header = {.payloadBytes = row.payloadBytes, .flags = row.flags, .id = 0};
         EXPECT_EQ(header.isValidRequest(), row.request) << row.payloadBytes << " " << row.flags;
         EXPECT_EQ(header.isValidReply(), row.reply) << row.payloadBytes << " " << row.flags;
@@ -73,16 +70,6 @@ TEST(Uuid, ValuesAndText) {
                               "00112233-4455-6677-8899-AABBCCDDEEFG", "0011223344-55-6677-8899-AABBCCDDEEFF",
                               "00112233-4455-6677-8899+AABBCCDDEEFF", "{0112233-4455-6677-8899-AABBCCDDEEFF"})
         EXPECT_FALSE(uuidOfText(wrong)) << wrong;
-}
-
-// The numbers that metadata files and messages carry keep their names.
-TEST(ContainerClasses, NumbersAndNames) {
-    for (std::uint64_t number = 0; number < 16; ++number)
-        EXPECT_EQ(isContainerClass(number), number >= 1 && number <= 13);
-    EXPECT_EQ(containerClassOfName("Data/KolvexPlugin"), ContainerClass::dataKolvexPlugin);
-    EXPECT_EQ(containerClassOfName("Shared/SystemGroup"), ContainerClass::sharedSystemGroup);
-    for (const char* wrong : {"", "Undefined", "data/application", "Data/Application/", "Application"})
-        EXPECT_FALSE(containerClassOfName(wrong)) << wrong;
 }
 
 static_assert(static_cast<std::uint64_t>(Command::retryTest) + 1 == commandCount);

@@ -157,17 +157,16 @@ TEST(PassedSockets, AreTakenByName) {
     }
     for (int i = 0; i < 3; ++i)
         EXPECT_EQ(::fcntl(first + i, F_GETFD), -1);
-    const PassedSockets::Variables meaningless[] = {
-        {.pid = std::to_string(::getppid()), .count = "1", .names = "ipsi"},
-        {.pid = "", .count = "1", .names = "ipsi"},
-        {.pid = self + "x", .count = "1", .names = "ipsi"},
-        {.pid = self, .count = "-1", .names = "ipsi"},
-        {.pid = self, .count = "1000000000", .names = "ipsi"},
-        {.pid = self, .count = "", .names = "ipsi"},
-    };
+    const std::pair<std::string, const char*> meaningless[] = {{std::to_string(::getppid()), "1"},
+                                                               {"", "1"},
+                                                               {self + "x", "1"},
+                                                               {self, "-1"},
+                                                               {self, "1000000000"},
+                                                               {self, ""}};
     pass(1);
-    for (const auto& variables : meaningless)
-        EXPECT_FALSE(PassedSockets::of(variables, first).take("ipsi").valid()) << variables.pid << variables.count;
+    for (const auto& [pid, count] : meaningless)
+        EXPECT_FALSE(PassedSockets::of({.pid = pid, .count = count, .names = "ipsi"}, first).take("ipsi").valid())
+            << pid << count;
     EXPECT_EQ(::close(first), 0) << "what is another's is left alone";
     EXPECT_FALSE(PassedSockets::of({.pid = self, .count = "1", .names = "ipsi"}, first).take("ipsi").valid());
 }
