@@ -6,8 +6,10 @@
 #include <cstdio>
 #include <cstring>
 #include <fcntl.h>
+#include <fstream>
 #include <linux/fuse.h>
 #include <poll.h>
+#include <string>
 #include <sys/mount.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -22,7 +24,7 @@ HangingFileSystem::HangingFileSystem(std::string at, uid_t server)
     char options[128];
     std::snprintf(options, sizeof options, "fd=%d,rootmode=%o,user_id=%u,group_id=%u,allow_other", device_.get(),
                   S_ISDIR(status.st_mode) ? 040755U : 0100644U, server, server);
-    mounted_ = ::mount("hanging", at_.c_str(), "fuse", MS_NOSUID | MS_NODEV, options) == 0;
+    mounted_ = ::mount(at_.c_str(), at_.c_str(), "fuse", MS_NOSUID | MS_NODEV, options) == 0;
 }
 
 void HangingFileSystem::answer(uid_t owner) {
@@ -71,8 +73,12 @@ void HangingFileSystem::answer(uid_t owner) {
 HangingFileSystem::~HangingFileSystem() {
     fallSilent();
     device_.reset();
-    if (mounted_)
-        ::umount2(at_.c_str(), MNT_DETACH);
+    // A container that was deleted has taken the mount in it along.
+    std::ifstream mounts("/proc/self/mounts");
+    std::string rest;
+    for (std::string source, place; mounts >> source >> place && std::getline(mounts, rest);)
+        if (source == at_)
+            ::umount2(place.c_str(), MNT_DETACH);
 }
 
 } // namespace zor::support
