@@ -27,23 +27,22 @@ public:
     /// Runs `question` on another thread, or waits for the one that is under way unless somebody has already waited in
     /// vain. None: it has not come back within `patience`, or there was no thread or no memory for it. Any thread.
     std::optional<Answer> ask(std::function<Answer()> question, std::chrono::milliseconds patience) {
-        State& state = *state_;
         const BlockingScope blocking;
-        const MutexLock held(state.mutex);
-        if (state.late || (!state.underWay && !begin(std::move(question))))
+        const MutexLock held(state_->mutex);
+        if (state_->late || (!state_->underWay && !begin(std::move(question))))
             return std::nullopt;
-        const std::uint64_t answersBefore = state.answers;
+        const std::uint64_t answersBefore = state_->answers;
         const auto until = std::chrono::steady_clock::now() + patience;
-        while (state.answers == answersBefore) {
+        while (state_->answers == answersBefore) {
             const auto left = until - std::chrono::steady_clock::now();
             if (left <= left.zero()) {
-                state.late = true;
+                state_->late = true;
                 return std::nullopt;
             }
-            state.ended.waitFor(state.mutex, std::chrono::duration_cast<std::chrono::milliseconds>(left) +
-                                                 std::chrono::milliseconds(1));
+            state_->ended.waitFor(state_->mutex, std::chrono::duration_cast<std::chrono::milliseconds>(left) +
+                                                     std::chrono::milliseconds(1));
         }
-        return state.answer;
+        return state_->answer;
     }
 
 private:
