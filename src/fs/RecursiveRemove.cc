@@ -48,7 +48,6 @@ private:
 
     platform::Disk& disk_;
     const RemoveCallbacks& callbacks_;
-    int stopError_ = 0;
     /// Why the root has to be looked at once more, or 0.
     int rootChanged_ = 0;
     /// Directories of the current path up to this depth hold something that could not be removed; -1: none does.
@@ -62,24 +61,21 @@ int Remover::remove(int directory, const char* name) {
         rootChanged_ = 0;
         doomedDepth_ = -1;
         const int result = walker.walk(directory, name, visitor);
-        if (result == -ECANCELED)
-            return -stopError_;
         if (result == -ENOENT && pass > 1)
             return 0;
         if (result < 0 || rootChanged_ == 0)
             return result;
         if (pass == passesMax) {
             const RemoveFailure failure{.error = rootChanged_, .parent = directory, .name = name};
-            return callbacks_.failed(failure) == RemoveAnswer::stop ? -failure.error : 0;
+            callbacks_.failed(failure);
+            return 0;
         }
     }
 }
 
 WalkStep Remover::visit(const WalkEntry& entry) {
-    if (callbacks_.goOn && !callbacks_.goOn()) {
-        stopError_ = ECANCELED;
+    if (callbacks_.goOn && !callbacks_.goOn())
         return WalkStep::stop;
-    }
     switch (entry.kind) {
     case WalkEntryKind::directory:
         // The doomed names of this depth belong to a directory before this one.
@@ -131,12 +127,7 @@ WalkStep Remover::changed(const WalkEntry& entry, int error) {
 }
 
 WalkStep Remover::failed(const WalkEntry& entry, int error) {
-    const RemoveAnswer answer =
-        callbacks_.failed({.path = entry.path(), .error = error, .parent = entry.parent, .name = entry.name});
-    if (answer == RemoveAnswer::stop) {
-        stopError_ = error;
-        return WalkStep::stop;
-    }
+    callbacks_.failed({.path = entry.path(), .error = error, .parent = entry.parent, .name = entry.name});
     struct stat status{};
     const bool repaired = statusOfName(entry.parent, entry.name, status) == ENOENT;
     if (!repaired)
@@ -181,7 +172,6 @@ int removeTree(platform::Disk& disk, int directory, const char* name, const std:
     callbacks.failed = [&](const RemoveFailure& failure) {
         if (firstError == 0)
             firstError = failure.error;
-        return RemoveAnswer::proceed;
     };
     const int result = removeTree(disk, directory, name, callbacks);
     return result < 0 ? result : -firstError;

@@ -25,12 +25,10 @@ struct RemoveFailure {
     const char* name = nullptr;
 };
 
-enum class RemoveAnswer { proceed, stop };
-
 struct RemoveCallbacks {
     /// Called for every item that cannot be removed, directories that stay because something in them stayed included.
     /// It may repair and remove the item itself: what holds it is then removed as if nothing had happened. Required.
-    std::function<RemoveAnswer(const RemoveFailure&)> failed;
+    std::function<void(const RemoveFailure&)> failed;
     /// Told, with its path as above, of each directory below the root whose immutable or append-only flag was in the
     /// way and was cleared. Optional.
     std::function<void(const std::string& path)> directoryMadeMutable;
@@ -38,8 +36,8 @@ struct RemoveCallbacks {
     std::function<bool()> goOn;
 };
 
-/// 0 when everything was removed or answered for by `failed`; -ENOENT when there is no such item; after the answer
-/// `stop`, the negative error that was answered so; another -errno when the root could not be examined.
+/// 0 when everything was removed or told to `failed`; -ENOENT when there is no such item; another -errno when the root
+/// could not be examined.
 int removeTree(platform::Disk& disk, int directory, const char* name, const RemoveCallbacks& callbacks);
 
 /// Removes what can be removed. 0, or the first error that kept an item, as -errno; `goOn` as above.

@@ -85,13 +85,12 @@ Result<void> ZORFileManager::removeItemIn(int directory, const FileURL& url) {
                 log_.write(logLevelNotice, function, "Unset UF_IMMUTABLE on %s", ZOR_SHOWN(path));
                 const int removed = disk_.unlinkFile(failure.parent, failure.name);
                 if (removed == 0)
-                    return fs::RemoveAnswer::proceed;
+                    return;
                 log_.write(logLevelError, function, "unlink of %s failed: %s", ZOR_SHOWN(path), errorText(-removed));
             }
         }
         if (firstError == 0)
             firstError = failure.error;
-        return fs::RemoveAnswer::proceed;
     };
     const int status = fs::removeTree(disk_, directory, std::string(url.lastPathComponent()).c_str(), callbacks);
     const int number = status < 0 && status != -ENOENT ? -status : firstError;

@@ -30,11 +30,10 @@ bool setFlags(int parent, const std::string& path, int wanted) {
 /// The paths of failed items, and of directories made mutable with a "+".
 struct Said {
     std::string text;
-    RemoveCallbacks callbacks(RemoveAnswer answer = RemoveAnswer::proceed) {
+    RemoveCallbacks callbacks() {
         return {.failed =
-                    [this, answer](const RemoveFailure& failure) {
+                    [this](const RemoveFailure& failure) {
                         text += failure.path + ":" + std::to_string(failure.error) + " ";
-                        return answer;
                     },
                 .directoryMadeMutable = [this](const std::string& path) { text += "+" + path + " "; }};
     }
@@ -105,7 +104,6 @@ TEST(RemoveTree, LetsACallbackRepairImmutableFiles) {
         EXPECT_EQ(failure.path + std::to_string(failure.error), "file1");
         EXPECT_EQ(clearImmutable(disk, failure.parent, failure.name), 1);
         EXPECT_EQ(disk.unlinkFile(failure.parent, failure.name), 0);
-        return RemoveAnswer::proceed;
     }};
     EXPECT_EQ(removeTree(disk, root.get(), "tree", callbacks), 0);
     EXPECT_FALSE(exists(root.get(), "tree"));
