@@ -11,8 +11,7 @@
 // An old one on another file system than staging would have to be copied there and back, for nothing. Where the new one
 // is a transient one beside it, both change places in one step instead, which needs no journal:
 //   1. as above                                                        stopped: a transient one is discarded
-//   2. the two change places                                           stopped: done, under the old one's directory
-//   name
+//   2. the two change places                                           stopped: done, under the old directory's name
 //   3. the new one gets its own name, unless the UUID is preserved     stopped: done
 //   4. the old one, a transient one by its place, goes to death row    stopped: a transient one is discarded
 //

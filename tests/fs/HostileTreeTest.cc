@@ -135,7 +135,7 @@ TEST(HostileTree, AnyDepthAndWidth) {
     EXPECT_EQ(visited, 3 * (depth + width) + 9);
     EXPECT_EQ(walker.vanishedDirectories(), 0U);
     EXPECT_LE(descriptorsMost - descriptorsBefore, 64U);
-    EXPECT_LT(residentBytes(), residentBefore + 4 * 1024 * 1024);
+    EXPECT_LT(residentBytes(), residentBefore + 8 * 1024 * 1024);
     EXPECT_EQ(diskUsage(openDirectory(root.get(), "tree").get(), "/r", {}).bytes, bytes);
     platform::LinuxDisk disk;
     ASSERT_EQ(copyTree(disk, root.get(), "tree/deep/d", root.get(), "copy"), 0);
