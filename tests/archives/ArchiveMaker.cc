@@ -1,7 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "archives/ArchiveMaker.h"
 
-#include <archive.h>
 #include <archive_entry.h>
 #include <memory>
 #include <stdexcept>
@@ -20,25 +19,6 @@ void check(archive* made, la_int64_t result) {
         throw std::runtime_error(std::string("archive: ") + ::archive_error_string(made));
 }
 
-struct FormParts {
-    int format = ARCHIVE_FORMAT_TAR_PAX_RESTRICTED;
-    int filter = ARCHIVE_FILTER_NONE;
-};
-/// In the order of Form.
-constexpr FormParts parts[] = {{},
-                               {.format = ARCHIVE_FORMAT_TAR_GNUTAR},
-                               {.filter = ARCHIVE_FILTER_GZIP},
-                               {.filter = ARCHIVE_FILTER_BZIP2},
-                               {.filter = ARCHIVE_FILTER_COMPRESS},
-                               {.filter = ARCHIVE_FILTER_LZ4},
-                               {.filter = ARCHIVE_FILTER_LZIP},
-                               {.filter = ARCHIVE_FILTER_LZMA},
-                               {.filter = ARCHIVE_FILTER_XZ},
-                               {.filter = ARCHIVE_FILTER_ZSTD},
-                               {.format = ARCHIVE_FORMAT_ZIP},
-                               {.format = ARCHIVE_FORMAT_CPIO_SVR4_NOCRC},
-                               {.format = ARCHIVE_FORMAT_7ZIP}};
-
 la_ssize_t append(archive* /*made*/, void* bytes, const void* buffer, std::size_t count) {
     static_cast<std::string*>(bytes)->append(static_cast<const char*>(buffer), count);
     return static_cast<la_ssize_t>(count);
@@ -49,8 +29,8 @@ la_ssize_t append(archive* /*made*/, void* bytes, const void* buffer, std::size_
 std::string makeArchive(Form form, const std::vector<Made>& entries) {
     std::string bytes;
     const std::unique_ptr<archive, Freed> made(::archive_write_new());
-    check(made.get(), ::archive_write_set_format(made.get(), parts[static_cast<std::size_t>(form)].format));
-    check(made.get(), ::archive_write_add_filter(made.get(), parts[static_cast<std::size_t>(form)].filter));
+    check(made.get(), ::archive_write_set_format(made.get(), form.format));
+    check(made.get(), ::archive_write_add_filter(made.get(), form.filter));
     ::archive_write_set_bytes_in_last_block(made.get(), 1);
     check(made.get(), ::archive_write_open(made.get(), &bytes, nullptr, append, nullptr));
     for (const Made& wanted : entries) {

@@ -2,6 +2,7 @@
 // Archives as a test describes them, hostile ones too.
 #pragma once
 
+#include <archive.h>
 #include <cstdint>
 #include <string>
 #include <sys/stat.h>
@@ -20,21 +21,28 @@ struct Made {
     std::int64_t hole = 0;
 };
 
-enum class Form {
-    tar,
-    gnuTar,
-    tarGzip,
-    tarBzip2,
-    tarCompress,
-    tarLz4,
-    tarLzip,
-    tarLzma,
-    tarXz,
-    tarZstd,
-    zip,
-    cpio,
-    sevenZip
+/// What the archive library calls it.
+struct Form {
+    int format;
+    int filter = ARCHIVE_FILTER_NONE;
+    bool operator==(const Form&) const = default;
+    static const Form tar, gnuTar, tarGzip, tarBzip2, tarCompress, tarLz4, tarLzip, tarLzma, tarXz, tarZstd, zip, cpio,
+        sevenZip;
 };
+inline constexpr int paxFormat = ARCHIVE_FORMAT_TAR_PAX_RESTRICTED;
+inline const Form Form::tar{paxFormat};
+inline const Form Form::gnuTar{ARCHIVE_FORMAT_TAR_GNUTAR};
+inline const Form Form::tarGzip{paxFormat, ARCHIVE_FILTER_GZIP};
+inline const Form Form::tarBzip2{paxFormat, ARCHIVE_FILTER_BZIP2};
+inline const Form Form::tarCompress{paxFormat, ARCHIVE_FILTER_COMPRESS};
+inline const Form Form::tarLz4{paxFormat, ARCHIVE_FILTER_LZ4};
+inline const Form Form::tarLzip{paxFormat, ARCHIVE_FILTER_LZIP};
+inline const Form Form::tarLzma{paxFormat, ARCHIVE_FILTER_LZMA};
+inline const Form Form::tarXz{paxFormat, ARCHIVE_FILTER_XZ};
+inline const Form Form::tarZstd{paxFormat, ARCHIVE_FILTER_ZSTD};
+inline const Form Form::zip{ARCHIVE_FORMAT_ZIP};
+inline const Form Form::cpio{ARCHIVE_FORMAT_CPIO_SVR4_NOCRC};
+inline const Form Form::sevenZip{ARCHIVE_FORMAT_7ZIP};
 
 /// The bytes. Throws std::runtime_error when the form cannot hold the entries.
 std::string makeArchive(Form form, const std::vector<Made>& entries);

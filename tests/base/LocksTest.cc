@@ -6,7 +6,6 @@
 #include "support/RecordingLog.h"
 #include "support/Waiting.h"
 
-#include <atomic>
 #include <future>
 #include <gtest/gtest.h>
 #include <random>

@@ -4,7 +4,6 @@
 #include "support/RecordingLog.h"
 #include "support/Waiting.h"
 
-#include <atomic>
 #include <gtest/gtest.h>
 
 namespace zor {

@@ -7,12 +7,9 @@
 #include "support/FileTree.h"
 #include "world/World.h"
 
-#include <atomic>
 #include <fcntl.h>
-#include <filesystem>
 #include <fstream>
 #include <gtest/gtest.h>
-#include <unistd.h>
 
 namespace zor::check {
 namespace {
@@ -307,7 +304,7 @@ TEST(StoreCheckTest, KnowsWhatIsNoFault) {
 TEST(StoreCheckTest, ReportsNothingOfWhatIsInFlight) {
     Store store;
     std::atomic<bool> stop{false};
-    test::inParallel(3, [&](int thread) {
+    support::inThreads(3, [&](unsigned thread) {
         for (int round = 0; thread == 0 && round < 5; ++round)
             EXPECT_EQ(textOf(store.check({.daemonServes = true})), "");
         stop = stop || thread == 0;

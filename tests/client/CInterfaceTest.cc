@@ -6,9 +6,6 @@
 
 #include <gtest/gtest.h>
 
-#include <cstring>
-#include <filesystem>
-#include <functional>
 #include <memory>
 #include <poll.h>
 #include <unistd.h>

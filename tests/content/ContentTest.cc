@@ -7,7 +7,7 @@
 #include "content/Powerless.h"
 #include "content/Unpacker.h"
 #include "os/LinuxDisk.h"
-#include "support/FaultLoop.h"
+#include "support/FaultDisk.h"
 #include "support/Files.h"
 #include "support/HangingFileSystem.h"
 #include "support/LongRun.h"
@@ -15,12 +15,8 @@
 #include "support/ProcessResources.h"
 
 #include <atomic>
-#include <fcntl.h>
-#include <filesystem>
-#include <fstream>
 #include <gtest/gtest.h>
 #include <sys/ioctl.h>
-#include <sys/mount.h>
 #include <sys/prctl.h>
 #include <sys/ptrace.h>
 #include <sys/socket.h>
@@ -170,7 +166,7 @@ TEST(Content, BrokenArchives) {
     for (const Form form :
          {Form::tar, Form::tarGzip, Form::tarXz, Form::tarZstd, Form::zip, Form::cpio, Form::sevenZip}) {
         const std::string whole = makeArchive(form, entries);
-        const std::string name = "form " + std::to_string(static_cast<int>(form));
+        const std::string name = "form " + std::to_string(form.format + form.filter);
         const auto cutAt = [&](std::size_t at) {
             rows.emplace_back(name + " cut at " + std::to_string(at), whole.substr(0, at));
         };
@@ -207,7 +203,7 @@ TEST(Content, GoodArchives) {
     for (const Form form :
          {Form::tar, Form::gnuTar, Form::tarGzip, Form::tarBzip2, Form::tarCompress, Form::tarLz4, Form::tarLzip,
           Form::tarLzma, Form::tarXz, Form::tarZstd, Form::zip, Form::cpio, Form::sevenZip}) {
-        SCOPED_TRACE(static_cast<int>(form));
+        SCOPED_TRACE(form.format + form.filter);
         const bool isTar = form != Form::zip && form != Form::cpio && form != Form::sevenZip;
         std::vector<Made> entries = {directory("."), directory("./a", 0500), file("./a/f", "text", 0444),
                                      // Twice.

@@ -3,13 +3,10 @@
 // at each, and the power going after each.
 #include "crash/Scenarios.h"
 #include "store/ZOREntitlementMapping.h"
-#include "support/FaultLoop.h"
+#include "support/FaultDisk.h"
 #include "support/LongRun.h"
 #include "support/PowerCut.h"
 #include "support/ProcessResources.h"
-
-#include <gtest/gtest.h>
-#include <unistd.h>
 
 namespace zor::support {
 namespace {
@@ -140,7 +137,6 @@ TEST(BootFaultTest, TheNextBootFinishesIt) {
     for (const Fault& fault : {Fault{.kind = FaultKind::error, .error = EIO},
                                Fault{.kind = FaultKind::error, .error = ENOSPC, .span = FaultSpan::fromThenOn},
                                Fault{.kind = FaultKind::stop}}) {
-        SCOPED_TRACE(fault.describe());
         platform::LinuxDisk linuxDisk;
         const LoopReport report = forEachFaultPoint(
             linuxDisk, fault, [](FaultDisk& disk) { return std::make_unique<OldDevice>(disk); },

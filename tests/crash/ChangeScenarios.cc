@@ -5,10 +5,6 @@
 #include "store/ReplaceJournal.h"
 #include "support/Files.h"
 
-#include <filesystem>
-#include <fstream>
-#include <memory>
-
 namespace zor::support {
 
 namespace {

@@ -3,9 +3,6 @@
 // first use of groups.
 #include "crash/Scenarios.h"
 
-#include <algorithm>
-#include <memory>
-
 namespace zor::support {
 
 namespace {

@@ -5,12 +5,8 @@
 #include "support/Files.h"
 #include "support/LongRun.h"
 
-#include <algorithm>
-#include <functional>
 #include <iterator>
-#include <set>
 #include <stdexcept>
-#include <utility>
 
 namespace zor::support {
 

@@ -5,7 +5,6 @@
 #include "crash/StoreWorld.h"
 
 #include <gtest/gtest.h>
-#include <set>
 
 namespace zor::support {
 

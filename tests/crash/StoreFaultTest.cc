@@ -1,12 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "crash/Scenarios.h"
 #include "fs/AtomicFile.h"
-#include "support/FaultLoop.h"
+#include "support/FaultDisk.h"
 #include "support/LongRun.h"
 #include "support/PowerCut.h"
 #include "support/ProcessResources.h"
-
-#include <gtest/gtest.h>
 
 namespace zor::support {
 namespace {
@@ -77,7 +75,6 @@ std::string judge(FaultWorld& world, const Scenario& scenario, const FaultOutcom
 }
 
 void loopOverFaults(const std::string& parent, Home home, const Scenario& scenario, const Fault& fault) {
-    SCOPED_TRACE(fault.describe());
     platform::LinuxDisk linuxDisk;
     const LoopReport report = forEachFaultPoint(
         linuxDisk, fault, [&](FaultDisk& disk) { return makeWorld(parent, home, scenario, disk); },

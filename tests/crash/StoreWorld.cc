@@ -2,13 +2,7 @@
 #include "crash/StoreWorld.h"
 
 #include "check/StoreCheck.h"
-#include "daemon/Daemon.h"
 #include "support/ProcessResources.h"
-
-#include <algorithm>
-#include <fstream>
-#include <sstream>
-#include <stdexcept>
 
 namespace zor::support {
 
@@ -84,82 +78,6 @@ std::string judgeByCheck(const std::string& root, const platform::BootMarker& ma
 }
 
 } // namespace
-
-std::string StoreDaemon::log() {
-    constexpr std::size_t linesMax = 200;
-    const std::vector<LogLine> lines = world.log.take();
-    std::ostringstream text;
-    for (std::size_t i = lines.size() > linesMax ? lines.size() - linesMax : 0; i < lines.size(); ++i)
-        text << "\n    " << lines[i];
-    return text.str();
-}
-
-void add(std::vector<Acknowledged>& promised, const Acknowledged& promise) {
-    std::erase_if(promised, [&](const Acknowledged& earlier) {
-        return promise.request.transient && earlier.request.transient &&
-               earlier.request.identifier == promise.request.identifier;
-    });
-    promised.push_back(promise);
-}
-
-fs::Ordering journalEverywhere(int) {
-    return fs::Ordering::journal;
-}
-fs::Ordering noOrderAnywhere(int) {
-    return fs::Ordering::none;
-}
-
-void StoreDaemon::launch() {
-    Daemon(world.services(), {}).setUp();
-}
-
-StoreDaemon::Answer StoreDaemon::ask(const Request& request, bool createIfNecessary) {
-    const auto found = client().createOrLookupContainerForUser(
-        request.userId, &request.identifier, request.containerClass,
-        {.createIfNecessary = createIfNecessary, .transient = request.transient});
-    if (!found)
-        return {.acknowledged = std::nullopt, .code = found.error().replyCode()};
-    return {.acknowledged = Acknowledged{request, found->path, found->uuid.string()}};
-}
-
-Device::Device(const std::string& parent, Home whereHome) : root(parent), home(whereHome) {
-    test::furnish(root.path());
-    // Each user takes the passes of a boot longer.
-    std::ofstream(root.path() + "/etc/passwd") << "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
-    if (home == Home::mounted && !mountedHome.emplace(root.path()).mounted())
-        throw std::runtime_error("cannot mount a home");
-}
-
-void Device::start(platform::Disk& onDisk, fs::Durability::Probe theProbe) {
-    disk = &onDisk;
-    probe = theProbe;
-    restart(onDisk);
-}
-
-void Device::restart(platform::Disk& onDisk) {
-    daemon.reset();
-    daemon = std::make_unique<StoreDaemon>(root.path(), marker, onDisk, probe);
-    daemon->launch();
-}
-
-Acknowledged Device::mustCreate(const Request& request) const {
-    const auto answer = daemon->create(request);
-    if (!answer.acknowledged)
-        throw std::runtime_error("cannot create " + request.identifier + daemon->log());
-    return *answer.acknowledged;
-}
-
-void Device::promise(const Request& request, const std::string& path) {
-    const auto found = daemon->lookUp(request);
-    add(promised, {request, path, found.acknowledged ? found.acknowledged->uuid : ""});
-}
-
-bool Device::create(const Request& request) {
-    const auto answer = daemon->create(request);
-    if (answer.acknowledged)
-        add(promised, *answer.acknowledged);
-    return answer.acknowledged.has_value();
-}
 
 std::string judgeAfterRestart(const std::string& root, platform::BootMarker& marker, fs::Durability::Probe probe,
                               const std::vector<Acknowledged>& promised, const std::vector<Request>& requests,

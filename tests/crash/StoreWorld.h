@@ -3,17 +3,22 @@
 // one daemon at a time on a root.
 #pragma once
 
+#include "daemon/Daemon.h"
 #include "support/StoreJudge.h"
 #include "world/World.h"
 
-#include <memory>
-#include <optional>
+#include <fstream>
+#include <sstream>
 
 namespace zor::support {
 
 /// How a file system on which the store is told to lie keeps order.
-fs::Ordering journalEverywhere(int fd);
-fs::Ordering noOrderAnywhere(int fd);
+inline fs::Ordering journalEverywhere(int) {
+    return fs::Ordering::journal;
+}
+inline fs::Ordering noOrderAnywhere(int) {
+    return fs::Ordering::none;
+}
 
 /// What asks for a container, and what it got.
 struct Request {
@@ -28,7 +33,13 @@ struct Acknowledged {
     std::string uuid;
 };
 /// Adds a promise. A transient container takes the place of the one before it.
-void add(std::vector<Acknowledged>& promised, const Acknowledged& promise);
+inline void add(std::vector<Acknowledged>& promised, const Acknowledged& promise) {
+    std::erase_if(promised, [&](const Acknowledged& earlier) {
+        return promise.request.transient && earlier.request.transient &&
+               earlier.request.identifier == promise.request.identifier;
+    });
+    promised.push_back(promise);
+}
 
 class StoreDaemon {
 public:
@@ -38,7 +49,7 @@ public:
         world.load(); // reads the entitlement file, as a start does
     }
     /// The setup before the first client; of the boot too where the marker is missing.
-    void launch();
+    void launch() { Daemon(world.services(), {}).setUp(); }
     /// An error code, or what the client was told.
     struct Answer {
         std::optional<Acknowledged> acknowledged;
@@ -49,13 +60,25 @@ public:
 
     [[nodiscard]] ZORClientConnection& client() { return world.daemonsClient(); }
     [[nodiscard]] ZOREntitlementMapping& entitlements() { return world.services().entitlements(); }
-    /// Its latest lines since the last call, for a test that fails.
-    [[nodiscard]] std::string log();
+    /// Its lines since the last call, for a test that fails.
+    [[nodiscard]] std::string log() {
+        std::ostringstream text;
+        for (const LogLine& line : world.log.take())
+            text << "\n    " << line;
+        return text.str();
+    }
 
     test::World world;
 
 private:
-    Answer ask(const Request& request, bool createIfNecessary);
+    Answer ask(const Request& request, bool createIfNecessary) {
+        const auto found = client().createOrLookupContainerForUser(
+            request.userId, &request.identifier, request.containerClass,
+            {.createIfNecessary = createIfNecessary, .transient = request.transient});
+        if (!found)
+            return {.acknowledged = std::nullopt, .code = found.error().replyCode()};
+        return {.acknowledged = Acknowledged{request, found->path, found->uuid.string()}};
+    }
 };
 
 /// A daemon over a store that is at rest, to be asked what only a client can see.
@@ -71,16 +94,43 @@ enum class Home { onRoot, mounted };
 
 /// A device for one run of a fault loop: its root, and what its clients were promised.
 struct Device {
-    explicit Device(const std::string& parent, Home home = Home::onRoot);
-    void start(platform::Disk& onDisk, fs::Durability::Probe probe);
+    explicit Device(const std::string& parent, Home whereHome = Home::onRoot) : root(parent), home(whereHome) {
+        test::furnish(root.path());
+        // Each user takes the passes of a boot longer.
+        std::ofstream(root.path() + "/etc/passwd") << "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
+        if (home == Home::mounted && !mountedHome.emplace(root.path()).mounted())
+            throw std::runtime_error("cannot mount a home");
+    }
+    void start(platform::Disk& onDisk, fs::Durability::Probe theProbe) {
+        disk = &onDisk;
+        probe = theProbe;
+        restart(onDisk);
+    }
     /// Another daemon in the place of the one that there is, on that disk.
-    void restart(platform::Disk& onDisk);
+    void restart(platform::Disk& onDisk) {
+        daemon.reset();
+        daemon = std::make_unique<StoreDaemon>(root.path(), marker, onDisk, probe);
+        daemon->launch();
+    }
     /// Creates a container and notes it as promised. False when the daemon did not.
-    bool create(const Request& request);
+    bool create(const Request& request) {
+        const auto answer = daemon->create(request);
+        if (answer.acknowledged)
+            add(promised, *answer.acknowledged);
+        return answer.acknowledged.has_value();
+    }
     /// The same without a promise; what is done to it takes it away or changes its place. Throws when it cannot.
-    Acknowledged mustCreate(const Request& request) const;
+    Acknowledged mustCreate(const Request& request) const {
+        const auto answer = daemon->create(request);
+        if (!answer.acknowledged)
+            throw std::runtime_error("cannot create " + request.identifier + daemon->log());
+        return *answer.acknowledged;
+    }
     /// Promises a path that was answered. What the daemon does not find there is promised too, and missed.
-    void promise(const Request& request, const std::string& path);
+    void promise(const Request& request, const std::string& path) {
+        const auto found = daemon->lookUp(request);
+        add(promised, {request, path, found.acknowledged ? found.acknowledged->uuid : ""});
+    }
     [[nodiscard]] ZORClientConnection& client() const { return daemon->client(); }
 
     TemporaryDirectory root;

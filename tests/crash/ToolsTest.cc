@@ -8,9 +8,7 @@
 
 #include <algorithm>
 #include <fcntl.h>
-#include <functional>
 #include <gtest/gtest.h>
-#include <map>
 
 namespace zor::support {
 namespace {

@@ -7,7 +7,6 @@
 
 #include <atomic>
 #include <gtest/gtest.h>
-#include <map>
 
 namespace zor::platform {
 namespace {

@@ -12,10 +12,7 @@
 
 #include <atomic>
 #include <cstring>
-#include <fcntl.h>
-#include <filesystem>
 #include <gtest/gtest.h>
-#include <span>
 #include <sys/wait.h>
 #include <sys/xattr.h>
 

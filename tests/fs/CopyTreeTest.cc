@@ -6,7 +6,6 @@
 
 #include "fs/TreeWorld.h"
 
-#include <filesystem>
 #include <linux/posix_acl.h>
 #include <linux/posix_acl_xattr.h>
 #include <sys/xattr.h>

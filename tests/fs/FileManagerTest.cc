@@ -13,9 +13,7 @@
 #include "support/SettableRoles.h"
 #include "support/TestRoot.h"
 
-#include <algorithm>
 #include <fcntl.h>
-#include <filesystem>
 #include <gtest/gtest.h>
 #include <sys/sysmacros.h>
 

@@ -1,11 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/TreeWorld.h"
 
-#include <random>
 #include <sched.h>
 #include <sys/mount.h>
 #include <sys/wait.h>
-#include <unistd.h>
 
 namespace zor::fs::test {
 
@@ -45,39 +43,11 @@ bool inChild(const std::function<bool()>& enter, const std::function<void()>& bo
 
 } // namespace
 
-void repeatForRace(const std::function<void()>& body, const std::function<bool()>& isEnough) {
-    const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(support::raceSeconds());
-    while (std::chrono::steady_clock::now() < end && !testing::Test::HasFailure() && !(isEnough && isEnough()))
-        body();
-}
-
-std::size_t openDescriptorCount() {
-    // Not from /proc, which a confined test does not have.
-    constexpr int descriptorsMax = 1024;
-    std::size_t count = 0;
-    for (int fd = 0; fd < descriptorsMax; ++fd)
-        count += ::fcntl(fd, F_GETFD) >= 0 ? 1 : 0;
-    return count;
-}
-
-struct stat statusOf(int parent, const std::string& path) {
-    struct stat status{};
-    checked(::fstatat(parent, path.c_str(), &status, AT_SYMLINK_NOFOLLOW), "stat " + path);
-    return status;
-}
-
 bool inMountNamespace(const std::function<void()>& body) {
     const auto enter = [] {
         return ::unshare(CLONE_NEWNS) == 0 && ::mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0;
     };
     return inChild(enter, body);
-}
-
-std::string chainPath(std::size_t depth) {
-    std::string path;
-    for (std::size_t level = 0; level < depth; ++level)
-        path += (level == 0 ? "a" : "/a") + std::to_string(level);
-    return path;
 }
 
 World::World() : root_(openDirectory(directory_.path())) {
@@ -117,31 +87,6 @@ bool World::confined(const std::function<void()>& body) {
         return confined_;
     };
     return inChild(enter, body);
-}
-
-std::string World::damage() const {
-    const std::string now = outside();
-    return now == before_ ? "" : "outside was\n" + before_ + "and is\n" + now;
-}
-
-Vandal::Vandal(const World& world) : world_(world) {
-    thread_ = std::thread([this] {
-        std::mt19937 random(static_cast<unsigned>(::getpid()));
-        while (!stopped_) {
-            for (int exchanges = 0; exchanges < 100 && !stopped_; ++exchanges)
-                exchange(random());
-            begun_ = true;
-            replaceFile(random());
-            moveOutAndBack(random());
-        }
-    });
-    while (!begun_)
-        std::this_thread::yield();
-}
-
-Vandal::~Vandal() {
-    stopped_ = true;
-    thread_.join();
 }
 
 /// A directory of the chain stands in outside/parking for a moment, with a link to there in its place.

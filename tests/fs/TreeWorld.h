@@ -11,11 +11,10 @@
 #include "support/LongRun.h"
 #include "support/ProcessResources.h"
 
-#include <algorithm>
 #include <atomic>
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <thread>
+#include <random>
 
 namespace zor::fs::test {
 
@@ -31,9 +30,24 @@ using support::openDirectory;
 using support::TemporaryDirectory;
 
 /// Calls `body` again and again for a while, until it is enough or fails.
-void repeatForRace(const std::function<void()>& body, const std::function<bool()>& isEnough = nullptr);
-std::size_t openDescriptorCount();
-struct stat statusOf(int parent, const std::string& path);
+inline void repeatForRace(const std::function<void()>& body, const std::function<bool()>& isEnough = nullptr) {
+    const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(support::raceSeconds());
+    while (std::chrono::steady_clock::now() < end && !testing::Test::HasFailure() && !(isEnough && isEnough()))
+        body();
+}
+inline std::size_t openDescriptorCount() {
+    // Not from /proc, which a confined test does not have.
+    constexpr int descriptorsMax = 1024;
+    std::size_t count = 0;
+    for (int fd = 0; fd < descriptorsMax; ++fd)
+        count += ::fcntl(fd, F_GETFD) >= 0 ? 1 : 0;
+    return count;
+}
+inline struct stat statusOf(int parent, const std::string& path) {
+    struct stat status{};
+    support::checked(::fstatat(parent, path.c_str(), &status, AT_SYMLINK_NOFOLLOW), "stat " + path);
+    return status;
+}
 inline std::uint64_t allocated(int parent, const std::string& path) {
     return static_cast<std::uint64_t>(statusOf(parent, path).st_blocks) * 512;
 }
@@ -42,7 +56,12 @@ inline std::uint64_t allocated(int parent, const std::string& path) {
 bool inMountNamespace(const std::function<void()>& body);
 
 /// "a0", "a0/a1" and so on.
-std::string chainPath(std::size_t depth);
+inline std::string chainPath(std::size_t depth) {
+    std::string path;
+    for (std::size_t level = 0; level < depth; ++level)
+        path += (level == 0 ? "a" : "/a") + std::to_string(level);
+    return path;
+}
 
 /// tree/: a0/a1/…, each with a file, a link, a FIFO and a small directory; wide/: many of each. outside/: files of
 /// another owner, and outside/parking/, which the vandal may move directories to.
@@ -58,7 +77,10 @@ public:
 
     void makeTree();
     /// What changed outside the tree since the world was made; empty when nothing did.
-    [[nodiscard]] std::string damage() const;
+    [[nodiscard]] std::string damage() const {
+        const std::string now = outside();
+        return now == before_ ? "" : "outside was\n" + before_ + "and is\n" + now;
+    }
     [[nodiscard]] int fd() const { return root_.get(); }
     [[nodiscard]] std::string path() const { return confined_ ? "" : directory_.path(); }
 
@@ -82,10 +104,24 @@ private:
 /// their place, adds names.
 class Vandal {
 public:
-    explicit Vandal(const World& world);
-    ~Vandal();
-    Vandal(const Vandal&) = delete;
-    Vandal& operator=(const Vandal&) = delete;
+    explicit Vandal(const World& world) : world_(world) {
+        thread_ = std::thread([this] {
+            std::mt19937 random(static_cast<unsigned>(::getpid()));
+            while (!stopped_) {
+                for (int exchanges = 0; exchanges < 100 && !stopped_; ++exchanges)
+                    exchange(random());
+                begun_ = true;
+                replaceFile(random());
+                moveOutAndBack(random());
+            }
+        });
+        while (!begun_)
+            std::this_thread::yield();
+    }
+    ~Vandal() {
+        stopped_ = true;
+        thread_.join();
+    }
 
 private:
     void moveOutAndBack(unsigned random);

@@ -10,15 +10,12 @@
 #include "support/Waiting.h"
 
 #include <csignal>
-#include <fcntl.h>
-#include <filesystem>
 #include <gtest/gtest.h>
 #include <linux/sched.h>
 #include <sys/socket.h>
 #include <sys/syscall.h>
 #include <sys/un.h>
 #include <sys/wait.h>
-#include <unistd.h>
 
 namespace zor::platform {
 
@@ -91,8 +88,6 @@ public:
         EXPECT_TRUE(pid_ < 0 || runs(start.runs.empty() ? shell : start.runs)) << "the process did not start";
     }
     ~PeerProcess() { end(); }
-    PeerProcess(const PeerProcess&) = delete;
-    PeerProcess& operator=(const PeerProcess&) = delete;
 
     [[nodiscard]] pid_t pid() const { return pid_; }
     /// This side of its connection.

@@ -4,7 +4,6 @@
 // "agent" is registered, "other" is not.
 #include "identity/PeerProcess.h"
 
-#include <fcntl.h>
 #include <sched.h>
 #include <sys/mount.h>
 #include <sys/prctl.h>

@@ -9,9 +9,6 @@
 #include <csignal>
 #include <cstdlib>
 #include <filesystem>
-#include <functional>
-#include <map>
-#include <optional>
 #include <systemd/sd-bus.h>
 #include <thread>
 #include <unistd.h>

@@ -6,13 +6,11 @@
 #include "support/Frames.h"
 #include "support/TestRoot.h"
 
-#include <algorithm>
 #include <csignal>
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sstream>
 #include <sys/resource.h>
-#include <sys/socket.h>
 
 namespace zor::platform {
 namespace {

@@ -6,11 +6,9 @@
 #include "support/TestRoot.h"
 #include "support/Waiting.h"
 
-#include <algorithm>
 #include <atomic>
 #include <gtest/gtest.h>
 #include <sys/eventfd.h>
-#include <sys/socket.h>
 
 namespace zor::platform {
 namespace {

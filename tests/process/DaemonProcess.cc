@@ -7,9 +7,7 @@
 
 #include <chrono>
 #include <csignal>
-#include <cstdio>
 #include <cstdlib>
-#include <filesystem>
 #include <thread>
 #include <unistd.h>
 
@@ -50,11 +48,11 @@ DaemonProcess::~DaemonProcess() {
 }
 
 void DaemonProcess::registerProgram(const std::string& fileName, const std::string& executable,
-                                    const std::string& entry) const {
+                                    const std::string& entry, const std::string& identifier) const {
     writeFile(path("etc/zorvane/identities.d/" + fileName + ".plist"),
-              "<?xml version=\"1.0\"?><plist version=\"1.0\"><dict><key>Identifier</key><string>org.example." +
-                  fileName + "</string><key>Executable</key><string>" + executable + "</string>" + entry +
-                  "</dict></plist>");
+              "<?xml version=\"1.0\"?><plist version=\"1.0\"><dict><key>Identifier</key><string>" +
+                  (identifier.empty() ? "org.example." + fileName : identifier) +
+                  "</string><key>Executable</key><string>" + executable + "</string>" + entry + "</dict></plist>");
 }
 
 void DaemonProcess::start(const std::vector<std::string>& moreArguments, const std::function<bool()>& prepare) {

@@ -7,10 +7,6 @@
 #include "support/Files.h"
 #include "zorvane/Client.h"
 
-#include <string>
-#include <sys/types.h>
-#include <vector>
-
 namespace zor::whole {
 
 inline constexpr std::uint64_t bundleApplication = 1;
@@ -27,8 +23,6 @@ public:
     enum class Syncs { off, on };
     explicit DaemonProcess(Syncs syncs = Syncs::off, const std::string& parent = "/dev/shm");
     ~DaemonProcess();
-    DaemonProcess(const DaemonProcess&) = delete;
-    DaemonProcess& operator=(const DaemonProcess&) = delete;
 
     /// Starts the daemon and waits until clients can connect. `prepare` as Program's.
     void start(const std::vector<std::string>& moreArguments = {}, const std::function<bool()>& prepare = {});
@@ -41,7 +35,8 @@ public:
     }
     [[nodiscard]] Outcome tool(const std::vector<std::string>& words) const { return runProgram(toolWords(words)); }
     /// A program of the registry: "<key>…</key>…", beside its identifier and executable.
-    void registerProgram(const std::string& fileName, const std::string& executable, const std::string& entry) const;
+    void registerProgram(const std::string& fileName, const std::string& executable, const std::string& entry,
+                         const std::string& identifier = "") const;
 
     [[nodiscard]] bool running() const { return daemon_ && daemon_->running(); }
     [[nodiscard]] pid_t pid() const { return daemon_->pid(); }

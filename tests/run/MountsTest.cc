@@ -4,10 +4,8 @@
 #include "support/FileTree.h"
 
 #include <algorithm>
-#include <filesystem>
 #include <functional>
 #include <gtest/gtest.h>
-#include <sys/mount.h>
 
 namespace zorvanerun {
 namespace {

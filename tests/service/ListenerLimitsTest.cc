@@ -4,7 +4,6 @@
 #include "service/ListenerWorld.h"
 #include "support/Allocations.h"
 
-#include <functional>
 #include <future>
 
 namespace zor::platform {
@@ -12,15 +11,14 @@ namespace {
 
 // Shares by user hold and balance: the charges alone, with users that no test can be.
 TEST(ListenerLimits, SharesByUser) {
-    ListenerLimits limits;
-    limits.connectionsMax = 10;
-    limits.connectionsMaxPerUser = 3;
-    limits.connectionsKeptForOwners = 2;
-    limits.inputBytesMax = 1000;
-    limits.inputBytesMaxPerUser = 400;
-    limits.inputBytesKeptForOwners = 200;
-    limits.outputBytesMaxPerUser = 500;
-    limits.outputBytesMaxOfOthers = 700;
+    const ListenerLimits limits{.connectionsMax = 10,
+                                .connectionsMaxPerUser = 3,
+                                .connectionsKeptForOwners = 2,
+                                .inputBytesMax = 1000,
+                                .inputBytesMaxPerUser = 400,
+                                .inputBytesKeptForOwners = 200,
+                                .outputBytesMaxPerUser = 500,
+                                .outputBytesMaxOfOthers = 700};
     ListenerCharges charges(limits);
     std::vector<ListenerCharges::Account*> accounts;
     const auto open = [&](uid_t uid, bool ownsRoot) {

@@ -19,9 +19,6 @@
 #include <mutex>
 #include <random>
 #include <semaphore>
-#include <set>
-#include <sys/socket.h>
-#include <sys/stat.h>
 #include <sys/syscall.h>
 
 namespace zor::platform {

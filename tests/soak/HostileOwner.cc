@@ -3,16 +3,12 @@
 
 #include "os/FileDescriptor.h"
 #include "support/FileTree.h"
+#include "support/Frames.h"
 
 #include <array>
-#include <cstdio>
 #include <fcntl.h>
 #include <filesystem>
-#include <functional>
 #include <stdexcept>
-#include <sys/socket.h>
-#include <sys/stat.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 namespace zor::soak {
@@ -85,22 +81,15 @@ zorvane::Result<void> HostileOwner::askOnce(zorvane::Client& client) {
         },
         [&] { return client.stageForDelete({address}); },
         [&] { return client.setInfoValue(address, "k", zorvane::Value{std::string("v")}); },
-        [&] {
-            return client.setDataProtection({.containerClass = dataApplication,
-                                             .user = hostileUser,
-                                             .identifier = identifier,
-                                             .protectionClass = asking_.oneIn(2) ? 1 : 3});
-        },
+        [&] { return client.setDataProtection({dataApplication, hostileUser, identifier, asking_.oneIn(2) ? 1 : 3}); },
     };
     return requests[asking_.upTo(std::size(requests))]();
 }
 
 void HostileOwner::askByHalves() {
-    sockaddr_un address{.sun_family = AF_UNIX, .sun_path = {}};
-    session_.daemon().path("run/zorvane/com.veltra.zorvaned").copy(address.sun_path, sizeof address.sun_path - 1);
     const platform::FileDescriptor socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
     const unsigned char frame[] = {75, 0, 0, 0, 1, 0, 0, 0, 1, 0, 0, 0, 0, 0, 0, 0, 'b', 'p', 'l', 'i', 's', 't'};
-    if (::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0)
+    if (support::connectTo(socket.get(), session_.daemon().path("run/zorvane/com.veltra.zorvaned")))
         (void)!::send(socket.get(), frame, asking_.upTo(sizeof frame), MSG_NOSIGNAL);
 }
 

@@ -6,8 +6,6 @@
 
 #include "soak/Session.h"
 
-#include <sys/types.h>
-
 namespace zor::soak {
 
 inline constexpr std::uint32_t hostileUser = 502;

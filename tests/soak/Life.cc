@@ -1,12 +1,11 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "soak/Life.h"
+// One client of the soak: its requests, the model that holds the daemon to what it acknowledged, and the looks at both.
+#include "soak/Session.h"
 
 #include <algorithm>
 #include <array>
 #include <filesystem>
 #include <fstream>
-#include <functional>
-#include <set>
 #include <sys/syscall.h>
 #include <unistd.h>
 
@@ -196,18 +195,11 @@ private:
 
     [[nodiscard]] static zorvane::Client::Lookup lookupOf(const Item& item, bool create = false,
                                                           bool transient = false) {
-        return {.containerClass = item.containerClass,
-                .user = item.user,
-                .identifier = item.identifier,
-                .create = create,
-                .transient = transient};
+        return {item.containerClass, item.user, item.identifier, create, transient};
     }
 
     [[nodiscard]] static zorvane::Client::Address addressOf(const Item& item, const Known& known) {
-        return {.containerClass = item.containerClass,
-                .user = item.user,
-                .identifier = item.identifier,
-                .uuid = known.uuid.value()};
+        return {item.containerClass, item.user, item.identifier, known.uuid.value()};
     }
 
     [[nodiscard]] State seen(const Item& item) {
@@ -369,11 +361,8 @@ private:
         if (item.containerClass == bundleApplication)
             return;
         const bool locked = session_.locked;
-        const auto changed = client_->setDataProtection({.containerClass = item.containerClass,
-                                                         .user = item.user,
-                                                         .identifier = item.identifier,
-                                                         .protectionClass = choices_.oneIn(2) ? 1 : 3,
-                                                         .thirdParty = true});
+        const auto changed = client_->setDataProtection(
+            {item.containerClass, item.user, item.identifier, choices_.oneIn(2) ? 1 : 3, true});
         if (!changed && changed.error().code == codeLocked && locked)
             session_.did(name_, "protect while locked", item.identifier);
         else

@@ -7,13 +7,10 @@
 #include <atomic>
 #include <cstdio>
 #include <deque>
-#include <map>
 #include <mutex>
 #include <random>
 #include <shared_mutex>
-#include <string>
 #include <thread>
-#include <vector>
 
 namespace zor::soak {
 
@@ -119,5 +116,9 @@ private:
     mutable std::mutex mutex_;
     Record record_;
 };
+
+/// One client with identifiers of its own: random requests until the session is stopped, and a look at everything.
+/// `user`: as whom it connects; root or a mobile user.
+void live(Session& session, unsigned number, std::uint32_t user, std::uint64_t seed);
 
 } // namespace zor::soak

@@ -3,15 +3,18 @@
 // homes that are missing, mounts that hang. And what must hold whenever it starts again.
 #pragma once
 
-#include "soak/Conditions.h"
+#include "soak/Session.h"
 
 namespace zor::soak {
 
 class Surroundings {
 public:
-    Surroundings(Session& session, Conditions& conditions, std::uint64_t seed, bool diskCanBeFilled);
+    /// Before the daemon starts: the user whose home comes and goes, the two programs and their entries.
+    Surroundings(Session& session, std::uint64_t seed, bool diskCanBeFilled);
     /// One event, after a random time below this.
     void happen(unsigned pauseMillisecondsMax);
+    /// One of two programs of one application, each entitled to a group, speaks; the groups of both must be there.
+    void oneOfTwoSpeaks(bool first);
     /// Ends all trouble.
     void settle();
     /// With the clients silent: `zorvanectl check` finds nothing but what the hostile owner did and what is allowed.
@@ -32,6 +35,11 @@ private:
     void end();
     void kill();
     void boot();
+    /// A home that is missing at a boot and comes later: nothing in it may be taken for gone.
+    void bootWithoutAHome();
+    /// Makes what must not be lost. False: no daemon answered.
+    bool hold();
+    [[nodiscard]] std::optional<zorvane::Client> client() const;
     void lock(bool locked);
     void fillDisk();
     void starve();
@@ -40,9 +48,11 @@ private:
     void enter(Trouble trouble);
 
     Session& session_;
-    Conditions& conditions_;
     Choices choices_;
     const bool diskCanBeFilled_;
+    const std::string home_;
+    std::string container_;
+    std::string group_;
     Count kills_ = 0;
     Count boots_ = 0;
 };

@@ -4,12 +4,11 @@
 //
 // The seed is printed first; the same one makes the same choices in each client, though not the same meetings of them.
 #include "soak/HostileOwner.h"
-#include "soak/Life.h"
 #include "soak/Surroundings.h"
+#include "support/Allocations.h"
 #include "support/LongRun.h"
 
 #include <CLI/CLI.hpp>
-#include <cstdio>
 #include <sys/mount.h>
 #include <unistd.h>
 
@@ -21,16 +20,6 @@ using Clock = std::chrono::steady_clock;
 constexpr std::size_t diskBytes = std::size_t{96} << 20;
 constexpr unsigned clientCount = 4;
 constexpr std::size_t grownKiBMax = 16384;
-#if defined(__has_feature)
-#if __has_feature(address_sanitizer)
-#define ZOR_FREED_MEMORY_IS_HELD
-#endif
-#endif
-#ifdef ZOR_FREED_MEMORY_IS_HELD
-constexpr bool judgesMemory = false; // AddressSanitizer keeps what was freed, up to a quarter of a gigabyte
-#else
-constexpr bool judgesMemory = true;
-#endif
 constexpr std::size_t grownDescriptorsMax = 16;
 
 struct Options {
@@ -51,8 +40,6 @@ public:
         if (mounted_)
             ::umount2(directory_.path().c_str(), MNT_DETACH);
     }
-    SmallDisk(const SmallDisk&) = delete;
-    SmallDisk& operator=(const SmallDisk&) = delete;
     [[nodiscard]] bool isMounted() const { return mounted_; }
     [[nodiscard]] const std::string& path() const { return directory_.path(); }
 
@@ -100,7 +87,8 @@ void calm(Session& session, const Surroundings& surroundings, double seconds) {
     const auto before = surroundings.size();
     wait(seconds * 2 / 3);
     const auto after = surroundings.size();
-    if ((judgesMemory && after.residentKiB > before.residentKiB + grownKiBMax) ||
+    // A sanitizer keeps what was freed, up to a quarter of a gigabyte.
+    if ((support::allocationsCanFail() && after.residentKiB > before.residentKiB + grownKiBMax) ||
         after.descriptors > before.descriptors + grownDescriptorsMax)
         session.found("the daemon grew from " + before.text() + " to " + after.text());
 }
@@ -131,14 +119,13 @@ int soak(const Options& options) {
         std::puts("skipped: mounts that hang; there is no /dev/fuse for this process");
     whole::DaemonProcess daemon(whole::DaemonProcess::Syncs::off, disk.path());
     Session session(daemon, options.verbose);
-    Conditions conditions(session);
+    Surroundings surroundings(session, options.seed, disk.isMounted());
     // Every other seed has the first user's home on a file system of its own.
     const std::string home = disk.isMounted() && options.seed % 2 == 1 ? daemon.path("private/var/mobile") : "";
     if (!home.empty() && ::mount("soak-home", home.c_str(), "tmpfs", 0, "mode=0755,uid=501,gid=501,size=64m") == 0)
         std::puts("the first user's home is a file system of its own");
     daemon.start();
-    conditions.oneOfTwoSpeaks(true);
-    Surroundings surroundings(session, conditions, options.seed, disk.isMounted());
+    surroundings.oneOfTwoSpeaks(true);
     HostileOwner hostile(session, options.seed);
     const auto begin = Clock::now();
 

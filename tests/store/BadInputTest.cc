@@ -5,10 +5,6 @@
 #include "ipc/Identifier.h"
 #include "store/DispatchFixture.h"
 
-#include <algorithm>
-#include <functional>
-#include <map>
-
 namespace zor::test {
 namespace {
 

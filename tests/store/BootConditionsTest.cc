@@ -5,8 +5,6 @@
 #include "support/EncryptedDisk.h"
 #include "world/World.h"
 
-#include <filesystem>
-#include <functional>
 #include <gtest/gtest.h>
 
 namespace zor::test {

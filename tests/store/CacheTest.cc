@@ -3,10 +3,7 @@
 // as it remembers.
 #include "world/World.h"
 
-#include <chrono>
-#include <filesystem>
 #include <gtest/gtest.h>
-#include <map>
 #include <random>
 
 namespace zor::test {

@@ -4,14 +4,7 @@
 #include "support/StoreJudge.h"
 #include "world/World.h"
 
-#include <algorithm>
-#include <array>
-#include <atomic>
-#include <chrono>
-#include <future>
 #include <gtest/gtest.h>
-#include <set>
-#include <utility>
 
 namespace zor::test {
 namespace {
@@ -101,7 +94,7 @@ TEST_F(Create, TransientContainersAreThrownAwayWhenAskedForAgain) {
 // noted.
 TEST_F(Create, LookupsBesideEveryWriter) {
     using Answer = std::pair<std::string, std::string>;
-    constexpr int readers = 3;
+    constexpr unsigned readers = 3;
     const std::string id = "com.example";
     std::set<Answer> noted;
     std::array<std::set<Answer>, readers> answers;
@@ -121,7 +114,7 @@ TEST_F(Create, LookupsBesideEveryWriter) {
         [&] { return world.stage(now) == ErrorCode::success && world.create(id).has_value(); },
     };
     noted.insert(answerOf(now));
-    inParallel(readers + 1, [&](int thread) {
+    inThreads(readers + 1, [&](unsigned thread) {
         if (thread == readers) {
             for (int round = 0; round < 60; ++round) {
                 wrong += !changes[static_cast<std::size_t>(round) % std::size(changes)]();
@@ -233,7 +226,7 @@ TEST(Layout, FirstLooksThatMeetSeeOneHome) {
     for (int round = 0; round < 200; ++round) {
         UserHome home(mobile, services.log(), services.defaultManager().resolver(), services.platform().passwords);
         std::atomic<int> wrong{0};
-        inParallel(4, [&](int) {
+        inThreads(4, [&](unsigned) {
             const auto seen = home.look();
             wrong += !seen.directory || *seen.directory != world.url("private/var/mobile");
         });

@@ -3,8 +3,6 @@
 #include "daemon/Daemon.h"
 #include "world/World.h"
 
-#include <algorithm>
-#include <filesystem>
 #include <gtest/gtest.h>
 #include <unistd.h>
 

@@ -6,10 +6,7 @@
 #include "store/ZOREntitlementMapping.h"
 #include "world/World.h"
 
-#include <filesystem>
 #include <gtest/gtest.h>
-#include <sys/stat.h>
-#include <thread>
 #include <unistd.h>
 
 namespace zor::test {

@@ -5,12 +5,7 @@
 #include "base/EntitlementKeys.h"
 #include "world/World.h"
 
-#include <chrono>
 #include <gtest/gtest.h>
-#include <memory>
-#include <string>
-#include <thread>
-#include <vector>
 
 namespace zor::test {
 

@@ -6,8 +6,6 @@
 #include "store/DispatchFixture.h"
 #include "store/ZOREntitlementMapping.h"
 
-#include <set>
-
 namespace zor::test {
 namespace {
 

@@ -6,12 +6,7 @@
 #include "store/ZOREntitlementMapping.h"
 #include "world/World.h"
 
-#include <algorithm>
-#include <atomic>
-#include <filesystem>
-#include <future>
 #include <gtest/gtest.h>
-#include <set>
 
 namespace zor::test {
 namespace {

@@ -4,13 +4,8 @@
 #include "support/OpenWatch.h"
 #include "world/World.h"
 
-#include <atomic>
-#include <filesystem>
-#include <future>
 #include <gtest/gtest.h>
 #include <sys/wait.h>
-#include <thread>
-#include <unistd.h>
 
 namespace zor::test {
 namespace {
@@ -286,7 +281,7 @@ TEST_F(Known, OperationsRunTogether) {
         makeEach,
         makeEach,
     };
-    inParallel(static_cast<int>(std::size(operations)), [&](int thread) {
+    inThreads(std::size(operations), [&](unsigned thread) {
         for (int i = 0; thread == 0 ? i < 80 : !end || i < made; ++i)
             operations[thread](i);
         end = end || thread == 0;

@@ -3,10 +3,7 @@
 #include "daemon/Daemon.h"
 #include "world/World.h"
 
-#include <algorithm>
-#include <filesystem>
 #include <gtest/gtest.h>
-#include <optional>
 #include <stdexcept>
 #include <unistd.h>
 

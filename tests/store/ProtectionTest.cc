@@ -6,16 +6,9 @@
 #include "support/OpenWatch.h"
 #include "world/World.h"
 
-#include <algorithm>
-#include <atomic>
 #include <csignal>
-#include <fcntl.h>
-#include <filesystem>
-#include <future>
 #include <gtest/gtest.h>
 #include <sys/file.h>
-#include <sys/stat.h>
-#include <unistd.h>
 
 namespace zor::test {
 namespace {

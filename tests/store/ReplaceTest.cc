@@ -3,12 +3,8 @@
 // state that a stop can leave.
 #include "world/World.h"
 
-#include <algorithm>
-#include <array>
 #include <fcntl.h>
-#include <filesystem>
 #include <gtest/gtest.h>
-#include <map>
 #include <tuple>
 
 namespace zor::test {

@@ -3,10 +3,8 @@
 // mappings.
 #include "world/World.h"
 
-#include <algorithm>
 #include <gtest/gtest.h>
 #include <new>
-#include <set>
 
 namespace zor::test {
 namespace {

@@ -4,7 +4,6 @@
 #include "support/FewDescriptors.h"
 #include "world/World.h"
 
-#include <filesystem>
 #include <gtest/gtest.h>
 #include <new>
 

@@ -4,7 +4,6 @@
 #include "world/World.h"
 
 #include <fcntl.h>
-#include <functional>
 #include <gtest/gtest.h>
 #include <unistd.h>
 

@@ -15,8 +15,6 @@ class FailingAllocations {
 public:
     explicit FailingAllocations(std::size_t failing);
     ~FailingAllocations();
-    FailingAllocations(const FailingAllocations&) = delete;
-    FailingAllocations& operator=(const FailingAllocations&) = delete;
     /// Whether one has failed.
     [[nodiscard]] static bool anyFailed();
 };
@@ -26,8 +24,6 @@ class NothingLarge {
 public:
     explicit NothingLarge(std::size_t bytes);
     ~NothingLarge();
-    NothingLarge(const NothingLarge&) = delete;
-    NothingLarge& operator=(const NothingLarge&) = delete;
 };
 
 /// Watches what this thread allocates from here on.

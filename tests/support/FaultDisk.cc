@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "support/FaultLoop.h"
+#include "support/FaultDisk.h"
 
 #include <cstring>
 #include <exception>
@@ -8,13 +8,6 @@
 namespace zor::support {
 
 using platform::MutexLock;
-
-std::string Fault::describe() const {
-    return "fault point " + std::to_string(point) + " as " +
-           (kind == FaultKind::stop
-                ? "a stop"
-                : ::strerrorname_np(error) + std::string(span == FaultSpan::once ? " once" : " from then on"));
-}
 
 void FaultDisk::arm(const Fault& fault) {
     const MutexLock lock(mutex_);
@@ -93,7 +86,9 @@ std::string DiskCallInfo::describe() const {
 }
 
 std::string FaultOutcome::describe() const {
-    return fault.describe() + (met ? " at " + call : " (not met)");
+    return "fault point " + std::to_string(fault.point) + " as " +
+           (fault.kind == FaultKind::stop ? "a stop" : ::strerrorname_np(fault.error)) +
+           (fault.span == FaultSpan::once ? "" : " from then on") + (met ? " at " + call : " (not met)");
 }
 
 } // namespace zor::support

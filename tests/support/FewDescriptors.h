@@ -15,8 +15,6 @@ class DescriptorLimit {
 public:
     DescriptorLimit() { ::getrlimit(RLIMIT_NOFILE, &before_); }
     ~DescriptorLimit() { ::setrlimit(RLIMIT_NOFILE, &before_); }
-    DescriptorLimit(const DescriptorLimit&) = delete;
-    DescriptorLimit& operator=(const DescriptorLimit&) = delete;
     bool set(rlim_t count) const {
         const rlimit limit = {.rlim_cur = count, .rlim_max = before_.rlim_max};
         return ::setrlimit(RLIMIT_NOFILE, &limit) == 0;

@@ -19,17 +19,6 @@ using platform::FileDescriptor;
 
 namespace {
 
-Bytes readAll(int fd) {
-    Bytes bytes;
-    std::uint8_t buffer[16384];
-    for (;;) {
-        const ssize_t count = checked(::read(fd, buffer, sizeof buffer), "read");
-        if (count == 0)
-            return bytes;
-        bytes.insert(bytes.end(), buffer, buffer + count);
-    }
-}
-
 std::map<std::string, Bytes> readAttributes(int fd) {
     std::map<std::string, Bytes> attributes;
     char names[4096];
@@ -44,8 +33,7 @@ std::map<std::string, Bytes> readAttributes(int fd) {
         if (!name.starts_with("user.") && !name.starts_with("trusted."))
             continue;
         Bytes value(4096);
-        const ssize_t size = checked(::fgetxattr(fd, name.c_str(), value.data(), value.size()), "fgetxattr " + name);
-        value.resize(static_cast<std::size_t>(size));
+        value.resize(checked(::fgetxattr(fd, name.c_str(), value.data(), value.size()), "fgetxattr " + name));
         attributes.emplace(name, std::move(value));
     }
     return attributes;
@@ -107,14 +95,12 @@ std::string FileTree::describe() const {
     std::map<std::string, std::string> lines;
     std::map<InodeId, std::string> names;
     std::vector<std::pair<std::string, InodeId>> pending = {{"", rootId}};
-    std::set<InodeId> above;
     while (!pending.empty()) {
         const auto [path, id] = pending.back();
         pending.pop_back();
         const Inode& inode = inodes.at(id);
-        char head[64];
-        std::snprintf(head, sizeof head, "%06o %u:%u", inode.mode, inode.uid, inode.gid);
-        std::string line = head;
+        std::string line(64, '\0');
+        line.resize(std::snprintf(line.data(), line.size(), "%06o %u:%u", inode.mode, inode.uid, inode.gid));
         if (!inode.isDirectory())
             line += " " + digest(inode.content);
         for (const auto& [name, value] : inode.attributes)
@@ -165,8 +151,10 @@ Inode readInode(int directory, const char* name) {
         constexpr int flags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC;
         const FileDescriptor fd(checked(::openat(directory, name, flags), name));
         inode.attributes = readAttributes(fd.get());
-        if (S_ISREG(status.st_mode))
-            inode.content = readAll(fd.get());
+        if (S_ISREG(status.st_mode)) {
+            inode.content.resize(static_cast<std::size_t>(status.st_size));
+            inode.content.resize(checked(::read(fd.get(), inode.content.data(), inode.content.size()), name));
+        }
     }
     return inode;
 }

@@ -5,17 +5,6 @@
 
 namespace zor::support {
 
-namespace {
-
-std::string describeLog(const DiskLog& log, std::size_t done) {
-    std::string text;
-    for (std::size_t i = 0; i < done; ++i)
-        text += "\n  #" + std::to_string(i) + " " + log.operations[i].describe();
-    return text;
-}
-
-} // namespace
-
 PowerCut::PowerCut(const DiskLog& log, const PowerCutOptions& options) : log_(log), options_(options) {
     std::map<std::pair<InodeId, std::string>, std::size_t> lastChange;
     for (std::size_t i = 0; i < log_.operations.size(); ++i) {
@@ -182,19 +171,13 @@ std::vector<PowerCut::Choice> PowerCut::unorderedChoices(std::size_t done) const
         }
         choices.push_back(std::move(choice));
     };
-    const auto all = [](std::size_t) { return true; };
-    const auto none = [](std::size_t) { return false; };
-    const auto names = [&](std::size_t i) { return log_.operations[i].changesNames(); };
-    const auto notData = [&](std::size_t i) { return !log_.operations[i].writes(); };
-    const auto notNames = [&](std::size_t i) { return !log_.operations[i].changesNames(); };
     const auto lost = [] { return DataFate::lost; };
-    choose(none, lost);
-    choose(all, lost);
-    choose(notNames, lost);
-    choose(names, lost);
-    choose(notData, lost);
-    choose(notData, [] { return DataFate::zeros; });
-    choose(notData, [] { return DataFate::cut; });
+    choose([](std::size_t) { return false; }, lost);
+    choose([](std::size_t) { return true; }, lost);
+    for (const bool names : {false, true})
+        choose([&](std::size_t i) { return log_.operations[i].changesNames() == names; }, lost);
+    for (const DataFate fate : {DataFate::lost, DataFate::zeros, DataFate::cut})
+        choose([&](std::size_t i) { return !log_.operations[i].writes(); }, [&] { return fate; });
     // The latest ones are what the operation at hand did; of the earlier ones some have to do.
     std::vector<std::size_t> single(uncertain.rbegin(), uncertain.rend());
     if (single.size() > options_.singleChangesMax / 2)
@@ -210,7 +193,7 @@ std::vector<PowerCut::Choice> PowerCut::unorderedChoices(std::size_t done) const
 }
 
 PowerCutState PowerCut::build(const Choice& choice, std::size_t done) const {
-    PowerCutState state{.tree = log_.start, .operationsDone = done};
+    PowerCutState state{.tree = log_.start};
     state.marksPassed = static_cast<std::size_t>(
         std::count_if(log_.marks.begin(), log_.marks.end(), [&](std::size_t mark) { return mark <= done; }));
     // Every inode exists from the start; it is there when a persisted name reaches it.
@@ -222,17 +205,16 @@ PowerCutState PowerCut::build(const Choice& choice, std::size_t done) const {
         LoggedOperation operation = log_.operations[i];
         const std::string label = " #" + std::to_string(i);
         if (operation.writes()) {
-            if (choice.data[i] == DataFate::lost) {
-                state.description += label + " data lost;";
+            Bytes& content = operation.value.content;
+            const std::size_t kept[] = {0, content.size(), content.size(), choice.cutTo[i]};
+            content.resize(kept[static_cast<std::size_t>(choice.data[i])]);
+            if (choice.data[i] == DataFate::zeros)
+                std::ranges::fill(content, std::uint8_t{0});
+            if (choice.data[i] != DataFate::kept)
+                state.description += label + (choice.data[i] == DataFate::zeros ? " zeros of " : " cut to ") +
+                                     std::to_string(content.size()) + ";";
+            if (choice.data[i] == DataFate::lost)
                 continue;
-            }
-            if (choice.data[i] == DataFate::zeros) {
-                state.description += label + " data zeros;";
-                std::fill(operation.value.content.begin(), operation.value.content.end(), std::uint8_t{0});
-            } else if (choice.data[i] == DataFate::cut) {
-                state.description += label + " data cut to " + std::to_string(choice.cutTo[i]) + ";";
-                operation.value.content.resize(choice.cutTo[i]);
-            }
         } else if (!choice.persisted[i]) {
             if (operation.changesNames() || operation.changesInode())
                 state.description += label + " lost;";
@@ -268,17 +250,17 @@ LoopReport forEachPowerCut(const DiskLog& log, const PowerCutOptions& options,
         for (const PowerCutState& state : cut.statesAfter(done)) {
             if (!judged.emplace(state.tree.describe(), state.marksPassed).second)
                 continue;
-            const TemporaryDirectory directory(options.scratch);
+            const TemporaryDirectory directory;
             materialise(state.tree, directory.path());
             ++report.examined;
             const std::string complaint = judge(state, directory.path());
             if (complaint.empty())
                 continue;
-            report.complaint = "power cut (" +
-                               std::string(options.model == DiskModel::unordered ? "unordered" : "ordered journal") +
-                               ", seed " + std::to_string(options.seed) + ") after " + std::to_string(done) + " of " +
-                               std::to_string(log.operations.size()) + " operations, with" + state.description + " " +
-                               complaint + describeLog(log, done);
+            report.complaint = options.model == DiskModel::unordered ? "unordered" : "ordered journal";
+            report.complaint +=
+                ", seed " + std::to_string(options.seed) + ", with" + state.description + " " + complaint;
+            for (std::size_t i = 0; i < done; ++i)
+                report.complaint += "\n  #" + std::to_string(i) + " " + log.operations[i].describe();
             return report;
         }
     }

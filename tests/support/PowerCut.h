@@ -21,7 +21,6 @@
 #include "support/RecordingDisk.h"
 
 #include <compare>
-#include <functional>
 #include <random>
 
 namespace zor::support {
@@ -36,14 +35,10 @@ struct PowerCutOptions {
     std::size_t singleChangesMax = 24;
     /// No cut before so many operations: what a test has only to prepare.
     std::size_t firstCut = 0;
-    /// Where states are built.
-    std::string scratch = "/dev/shm";
 };
 
 struct PowerCutState {
     FileTree tree;
-    /// The power went after this many operations of the log.
-    std::size_t operationsDone = 0;
     /// How many marks of the log lie before the cut.
     std::size_t marksPassed = 0;
     /// Which of the uncertain changes are there, in words.

@@ -26,30 +26,15 @@ std::uint64_t writeOffset(int fd) {
     return static_cast<std::uint64_t>(status.st_size);
 }
 
-Bytes readAt(int fd, std::uint64_t offset, std::size_t count) {
-    Bytes bytes(count);
-    std::size_t done = 0;
-    while (done < count) {
-        const ssize_t got = ::pread(fd, bytes.data() + done, count - done, static_cast<off_t>(offset + done));
-        if (got <= 0)
-            break;
-        done += static_cast<std::size_t>(got);
-    }
-    bytes.resize(done);
-    return bytes;
-}
-
-/// The first line that only one of two descriptions has.
+/// The place at which two descriptions begin to differ; empty when they do not.
 std::string firstDifference(const std::string& recorded, const std::string& onDisk) {
     if (recorded == onDisk)
         return "";
-    std::size_t line = 0;
-    for (std::size_t i = 0; i < recorded.size() && i < onDisk.size() && recorded[i] == onDisk[i]; ++i) {
-        if (recorded[i] == '\n')
-            line = i + 1;
-    }
-    const auto lineOf = [&](const std::string& text) { return text.substr(line, text.find('\n', line) - line); };
-    return "the recorded tree has \"" + lineOf(recorded) + "\" where the disk has \"" + lineOf(onDisk) + "\"";
+    constexpr std::size_t shown = 200;
+    const auto at = static_cast<std::size_t>(std::ranges::mismatch(recorded, onDisk).in1 - recorded.begin());
+    const std::size_t from = at - std::min(at, shown / 2);
+    return "the recorded tree has \"" + recorded.substr(from, shown) + "\" where the disk has \"" +
+           onDisk.substr(from, shown) + "\"";
 }
 
 } // namespace
@@ -74,18 +59,13 @@ bool LoggedOperation::touches(InodeId id) const {
 }
 
 std::string LoggedOperation::describe() const {
-    std::string text = nameOf(call);
-    if (call == DiskCall::rename)
-        return text + " " + std::to_string(directory) + "/" + name + " -> " + std::to_string(toDirectory) + "/" +
-               toName + " (" + std::to_string(inode) + ")";
+    std::string text = nameOf(call) + (" of " + std::to_string(inode)) + " " + attribute;
     if (changesNames())
-        return text + " " + std::to_string(directory) + "/" + name + " (" + std::to_string(inode) + ")";
-    if (inode != 0)
-        text += " " + std::to_string(inode);
-    if (call == DiskCall::setAttribute)
-        text += " " + attribute;
+        text += std::to_string(directory) + "/" + name;
+    if (call == DiskCall::rename)
+        text += " -> " + std::to_string(toDirectory) + "/" + toName;
     if (writes())
-        text += " " + std::to_string(value.content.size()) + " at " + std::to_string(offset);
+        text += std::to_string(value.content.size()) + " bytes at " + std::to_string(offset);
     return text;
 }
 
@@ -227,31 +207,18 @@ ssize_t RecordingDisk::intercept(const DiskCallInfo& info, const Make& make) {
     const ssize_t result = make();
     if (result < 0)
         return result;
+    const DiskCall call = info.call;
     struct stat synced = {};
-    switch (info.call) {
-    case DiskCall::makeDirectory:
-    case DiskCall::createFile:
-    case DiskCall::makeSymbolicLink:
-    case DiskCall::makeFifo:
+    if (LoggedOperation{.call = call}.makesInode())
         addNew(info);
-        break;
-    case DiskCall::unlinkFile:
-    case DiskCall::removeDirectory:
+    else if (call == DiskCall::unlinkFile || call == DiskCall::removeDirectory)
         addRemoval(info);
-        break;
-    case DiskCall::changeMode:
-    case DiskCall::changeOwner:
-    case DiskCall::sync:
-    case DiskCall::orderData:
+    else if (call == DiskCall::changeMode || call == DiskCall::changeOwner || call == DiskCall::sync ||
+             call == DiskCall::orderData)
         addOnDescriptor(info);
-        break;
-    case DiskCall::syncFileSystem:
-        if (recording_ && ::fstat(info.fd, &synced) == 0)
-            add({.call = info.call, .device = synced.st_dev});
-        break;
-    default: // the others have methods of their own, or are not modelled
-        break;
-    }
+    else if (call == DiskCall::syncFileSystem && recording_ && ::fstat(info.fd, &synced) == 0)
+        add({.call = call, .device = synced.st_dev});
+    // The others have methods of their own, or are not modelled.
     return result;
 }
 
@@ -323,8 +290,10 @@ ssize_t RecordingDisk::copyData(int from, int to, std::size_t bytesMax) {
     const auto source = static_cast<std::uint64_t>(::lseek(from, 0, SEEK_CUR));
     const std::uint64_t offset = writeOffset(to);
     const ssize_t count = inner().copyData(from, to, bytesMax);
-    if (count > 0)
-        addData(to, offset, readAt(from, source, static_cast<std::size_t>(count)));
+    Bytes bytes(static_cast<std::size_t>(std::max<ssize_t>(count, 0)));
+    if (::pread(from, bytes.data(), bytes.size(), static_cast<off_t>(source)) != std::ssize(bytes))
+        complaint_ += "a copy's source changed meanwhile; ";
+    addData(to, offset, std::move(bytes));
     return count;
 }
 

@@ -55,51 +55,39 @@ constexpr ContainerKind kinds[] = {
     {13, "Shared/SystemGroup", system, 499, 0, inGroups, 0777},
 };
 
-/// What is wrong with the kind, mode or owner; empty when nothing is. Only root can give things to others.
-std::string attributesComplaint(const Inode& inode, mode_t kindAndMode, std::uint32_t owner) {
-    if (inode.mode != kindAndMode)
-        return "has mode " + std::to_string(inode.mode);
-    const bool ownersCount = ::geteuid() == 0;
-    if (ownersCount && (inode.uid != owner || inode.gid != owner))
-        return "belongs to " + std::to_string(inode.uid) + ":" + std::to_string(inode.gid);
-    return "";
+/// What is wrong with the kind, mode or owner of an item; empty when nothing is. Only root can give things to others.
+std::string itemComplaint(const FileTree& tree, const std::string& path, mode_t kindAndMode, std::uint32_t owner) {
+    const InodeId id = tree.resolve(path);
+    const Inode& inode = tree.inodes.at(id == 0 ? FileTree::rootId : id);
+    const bool isOwned = ::geteuid() != 0 || (inode.uid == owner && inode.gid == owner);
+    if (id != 0 && inode.mode == kindAndMode && isOwned)
+        return "";
+    return path + (id == 0 ? " is missing; "
+                           : " has mode " + std::to_string(inode.mode) + " and belongs to " +
+                                 std::to_string(inode.uid) + ":" + std::to_string(inode.gid) + "; ");
 }
 
-std::string readMetadata(const Inode& file, const ContainerKind& kind, StoredContainer& container) {
-    if (const std::string wrong = attributesComplaint(file, S_IFREG | 0644, 0); !wrong.empty())
-        return "its metadata file " + wrong;
-    const auto value = plist::readPropertyList(file.content);
+/// Also fills in what the metadata file tells.
+std::string judgeContainer(const FileTree& tree, const ContainerKind& kind, StoredContainer& container) {
+    const std::string metadata = container.path + "/.com.veltra.zorvane.metadata.plist";
+    std::string complaint = itemComplaint(tree, container.path, S_IFDIR | 0755, kind.owner) +
+                            itemComplaint(tree, metadata, S_IFREG | 0644, 0);
+    for (const char* subdirectory : kind.inside)
+        complaint += itemComplaint(tree, container.path + "/" + subdirectory, S_IFDIR | kind.insideMode, kind.owner);
+    if (!complaint.empty())
+        return complaint;
+    const auto value = plist::readPropertyList(tree.inodes.at(tree.resolve(metadata)).content);
     const plist::Dictionary* content = value ? value->asDictionary() : nullptr;
-    if (!content)
-        return "its metadata file holds no dictionary";
+    if (!content || content->unsignedInteger("ZORMetadataContentClass") != kind.number ||
+        content->unsignedInteger("ZORMetadataPersona") != kind.user)
+        return metadata + " holds no dictionary, or another class's or user's; ";
     const std::string* identifier = content->string("ZORMetadataIdentifier");
     const std::string* uuid = content->string("ZORMetadataUUID");
     if (!identifier || !uuid || uuid->size() != 36)
-        return "its metadata file lacks the identifier or the UUID";
-    if (content->unsignedInteger("ZORMetadataContentClass") != kind.number ||
-        content->unsignedInteger("ZORMetadataPersona") != kind.user)
-        return "its metadata file is another class's or user's";
+        return metadata + " lacks the identifier or the UUID; ";
     container.identifier = *identifier;
     container.uuid = *uuid;
     return "";
-}
-
-std::string judgeContainer(const FileTree& tree, InodeId id, const ContainerKind& kind, StoredContainer& container) {
-    const Inode& top = tree.inodes.at(id);
-    if (const std::string wrong = attributesComplaint(top, S_IFDIR | 0755, kind.owner); !wrong.empty())
-        return wrong;
-    for (const char* subdirectory : kind.inside) {
-        const InodeId inside = tree.resolve(container.path + "/" + subdirectory);
-        if (inside == 0)
-            return std::string("lacks ") + subdirectory;
-        const std::string wrong = attributesComplaint(tree.inodes.at(inside), S_IFDIR | kind.insideMode, kind.owner);
-        if (!wrong.empty())
-            return std::string("its ") + subdirectory + " " + wrong;
-    }
-    const auto metadata = top.entries.find(".com.veltra.zorvane.metadata.plist");
-    if (metadata == top.entries.end())
-        return "lacks its metadata file";
-    return readMetadata(tree.inodes.at(metadata->second), kind, container);
 }
 
 void judgeClassDirectory(const FileTree& tree, const ContainerKind& kind, bool transient, StoreFindings& findings) {
@@ -112,10 +100,9 @@ void judgeClassDirectory(const FileTree& tree, const ContainerKind& kind, bool t
         if (name.starts_with("."))
             continue;
         StoredContainer container{.classNumber = kind.number, .transient = transient, .path = path + "/" + name};
-        const std::string wrong = judgeContainer(tree, id, kind, container);
-        if (!wrong.empty())
-            findings.complaint += container.path + " " + wrong + "; ";
-        else if (findings.find(kind.number, transient, container.identifier) != nullptr)
+        const std::string wrong = judgeContainer(tree, kind, container);
+        findings.complaint += wrong;
+        if (wrong.empty() && findings.find(kind.number, transient, container.identifier) != nullptr)
             findings.doubled += container.path + " is a second container of " + container.identifier + "; ";
         if (wrong.empty())
             findings.containers.push_back(std::move(container));

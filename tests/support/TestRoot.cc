@@ -1,33 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "support/TestRoot.h"
 
-#include "support/Files.h"
-
-#include <algorithm>
-#include <cstdio>
-#include <filesystem>
-
 namespace zor::support {
-
-std::string itemAt(const std::string& path) {
-    struct stat status{};
-    if (::lstat(path.c_str(), &status) != 0)
-        return "missing";
-    const char* kind = S_ISDIR(status.st_mode) ? "directory" : S_ISREG(status.st_mode) ? "file" : "other";
-    char text[96];
-    std::snprintf(text, sizeof text, "%s %04o %u:%u", kind, static_cast<unsigned>(status.st_mode & 07777),
-                  status.st_uid, status.st_gid);
-    return text;
-}
-
-std::vector<std::string> namesIn(const std::string& directory) {
-    std::vector<std::string> found;
-    std::error_code none;
-    for (const auto& entry : std::filesystem::directory_iterator(directory, none))
-        found.push_back(entry.path().filename());
-    std::ranges::sort(found);
-    return found;
-}
 
 void furnish(const std::string& root) {
     checked(::chmod(root.c_str(), 0755), root);
@@ -53,24 +27,6 @@ void furnish(const std::string& root) {
     }
 }
 
-TestRoot::TestRoot(const std::string& parent, const std::string& existing)
-    : path_(existing.empty() ? directory_.emplace(parent).path() : existing) {
-    checked(::chmod(path_.c_str(), 0755), path_);
-}
-
-const platform::SystemRoot& TestRoot::root() const {
-    if (!root_) {
-        root_ = platform::SystemRoot::open(path_).value();
-        errno = root_->makeRuntimeDirectory(disk_);
-        checked(errno == 0 ? 0 : -1, "the runtime directory");
-    }
-    return *root_;
-}
-
-std::string TestRoot::path(std::string_view relative) const {
-    return relative.empty() ? path_ : path_ + "/" + std::string(relative);
-}
-
 void TestRoot::makeDirectories(std::string_view relative, std::optional<uid_t> lastOwner, mode_t mode) const {
     for (std::size_t end = relative.find('/');; end = relative.find('/', end + 1)) {
         const std::filesystem::path level = path(relative.substr(0, end));
@@ -88,23 +44,6 @@ void TestRoot::makeDirectories(std::string_view relative, std::optional<uid_t> l
         if (last)
             return;
     }
-}
-
-void TestRoot::write(std::string_view relative, std::string_view bytes, mode_t mode) const {
-    const std::size_t slash = relative.rfind('/');
-    if (slash != std::string_view::npos && !exists(relative.substr(0, slash)))
-        makeDirectories(relative.substr(0, slash));
-    writeFile(path(relative), bytes, mode);
-}
-
-void TestRoot::replace(std::string_view relative, std::string_view bytes, mode_t mode) const {
-    const std::string temporary = std::string(relative) + "~";
-    write(temporary, bytes, mode);
-    checked(::rename(path(temporary).c_str(), path(relative).c_str()), temporary);
-}
-
-std::string TestRoot::read(std::string_view relative) const {
-    return readFile(path(relative));
 }
 
 } // namespace zor::support

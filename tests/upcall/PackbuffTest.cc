@@ -3,9 +3,7 @@
 
 #include "upcall/PackbuffWorld.h"
 
-#include <algorithm>
 #include <functional>
-#include <gtest/gtest.h>
 #include <limits>
 
 namespace zor::test {

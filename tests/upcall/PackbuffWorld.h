@@ -4,15 +4,12 @@
 
 #include "upcall/UpcallPackets.h"
 
-#include <algorithm>
 #include <cstdint>
 #include <cstdio>
-#include <cstring>
 #include <fstream>
 #include <regex>
 #include <span>
 #include <stdexcept>
-#include <string>
 #include <sys/mman.h>
 #include <unistd.h>
 

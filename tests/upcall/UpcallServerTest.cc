@@ -4,8 +4,6 @@
 #include "upcall/ProcessContainersReply.h"
 #include "upcall/UpcallWorld.h"
 
-#include <gtest/gtest.h>
-#include <sys/socket.h>
 #include <sys/wait.h>
 #include <tuple>
 

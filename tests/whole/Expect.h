@@ -5,7 +5,6 @@
 #include "process/Program.h"
 
 #include <gtest/gtest.h>
-#include <string>
 
 namespace zor::whole {
 

@@ -1,23 +1,18 @@
 // SPDX-License-Identifier: Apache-2.0
 // zorvanectl install against a real daemon: what comes in, and what stays when it does not.
 #include "archives/ArchiveMaker.h"
+#include "ipc/Keys.h"
 #include "process/DaemonProcess.h"
-#include "process/Relay.h"
+#include "support/FakeServer.h"
 #include "whole/Expect.h"
 
 #include <atomic>
 #include <chrono>
 #include <csignal>
 #include <cstdlib>
-#include <fcntl.h>
-#include <filesystem>
-#include <functional>
 #include <future>
-#include <gtest/gtest.h>
-#include <set>
 #include <sys/ptrace.h>
 #include <sys/syscall.h>
-#include <thread>
 #include <unistd.h>
 
 namespace zor::whole {
@@ -50,6 +45,39 @@ void install(const DaemonProcess& daemon, const std::string& source) {
     const auto done = runProgram(installing(daemon.root(), source));
     ASSERT_EQ(done.exitStatus, 0) << done.output;
 }
+
+/// What becomes of a request: it reaches the daemon; nothing comes for ten seconds, or until the client goes, and then
+/// the connection ends; it ends at once.
+enum class Fate { passedOn, unanswered, hungUp };
+
+/// A root with a socket that passes requests on to a real daemon, or loses them where the test wants that: what a
+/// client meets whose daemon is slow, or is being started anew. `judge` is called by a thread for each connection.
+class Relay : public support::FakeServer {
+public:
+    Relay(const DaemonProcess& daemon, std::function<Fate(ipc::Command)> judge)
+        : FakeServer([path = daemon.path("run/zorvane/com.veltra.zorvaned"), judge = std::move(judge)](int from) {
+              const platform::FileDescriptor to(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+              EXPECT_TRUE(support::connectTo(to.get(), path));
+              while (const auto request = support::receiveFrame(from)) {
+                  const auto command = request->message().unsignedInteger(ipc::keys::command).value_or(0);
+                  const Fate fate = judge(static_cast<ipc::Command>(command));
+                  if (fate == Fate::unanswered) {
+                      support::limitWaiting(from);
+                      (void)support::receiveFrame(from);
+                  }
+                  if (fate != Fate::passedOn)
+                      return;
+                  support::sendAll(to.get(), frameOf(*request));
+                  if (const auto reply = support::receiveFrame(to.get()))
+                      support::sendAll(from, frameOf(*reply));
+              }
+          }) {}
+
+private:
+    static plist::Data frameOf(const support::Frame& frame) {
+        return support::frameOf(frame.header.payloadBytes, frame.header.flags, frame.header.id, frame.payload);
+    }
+};
 
 /// An installer whose system calls are looked at.
 class TracedInstaller {
@@ -102,10 +130,7 @@ std::string pathOf(const DaemonProcess& daemon, std::uint64_t containerClass, bo
     const auto list = client.list(containerClass, user, transient);
     for (std::size_t i = 0; list && i < list->size(); ++i)
         if ((*list)[i].identifier == identifier)
-            return client
-                .metadata(
-                    {.containerClass = containerClass, .user = user, .identifier = identifier, .uuid = (*list)[i].uuid})
-                ->path;
+            return client.metadata({containerClass, user, identifier, (*list)[i].uuid})->path;
     return {};
 }
 
@@ -155,7 +180,13 @@ TEST(Install, DirectoryThenArchive) {
     writeFile(folder + "/Documents/deep/f", std::string(300'000, 'f'));
     writeFile(folder + "/Library/\n", "x");
     std::filesystem::create_symlink("Documents/deep", folder + "/link");
-    writeFile(place.path() + "/archive", makeArchive(Form::tarXz, {file("only/f", "new")}));
+    const std::string archive = place.path() + "/archive";
+    writeFile(archive, makeArchive(Form::tarXz, {file("only/f", "new")}));
+    const auto throughShell = [&](const char* script, const std::vector<std::string>& words) {
+        std::vector<std::string> all = {"/bin/sh", "-c", script, archive};
+        all.insert(all.end(), words.begin(), words.end());
+        return runProgram(all);
+    };
     for (const auto containerClass : {bundleApplication, dataApplication}) {
         const auto first = runProgram(installing(daemon.root(), folder, containerClass));
         expectOutcome(first, 0, "\"phase\": \"syncing\"");
@@ -168,31 +199,18 @@ TEST(Install, DirectoryThenArchive) {
             for (const char* there : {"/Library/\n", "/Library/Caches", "/Library/Preferences", "/tmp"})
                 EXPECT_TRUE(std::filesystem::exists(path + there)) << there;
         }
-        std::vector<std::string> piped = {"/bin/sh", "-c", "cat \"$0\" | \"$@\"", place.path() + "/archive"};
-        for (const std::string& word : installing(daemon.root(), "-", containerClass))
-            piped.push_back(word);
-        expectOutcome(runProgram(piped), 0, "\"replaced\": true");
+        expectOutcome(throughShell("cat \"$0\" | \"$@\"", installing(daemon.root(), "-", containerClass)), 0,
+                      "\"replaced\": true");
         const std::string newPath = pathOf(daemon, containerClass);
         EXPECT_EQ(readFile(newPath + "/only/f"), "new");
         EXPECT_FALSE(std::filesystem::exists(path) || std::filesystem::exists(newPath + "/link"));
         EXPECT_TRUE(isGone(daemon));
     }
+    // What is said does not go into the daemon's socket, which gets the third number.
+    expectOutcome(throughShell("exec \"$@\" 0<&- 1>&- 2>&-", installing(daemon.root(), archive)), 0, "");
+    EXPECT_EQ(daemon.counter("BrokenFrames"), 0);
     for (const auto& [source, whereTo] : {std::pair("/nowhere", "1"), std::pair("/etc", "shared-app")})
         EXPECT_EQ(daemon.tool({"install", identifier, source, "--class", whereTo, "--yes"}).exitStatus, 2);
-}
-
-// Goal: what is said does not go into a file or socket that got a standard descriptor's number. Method: an installation
-// without any, where the third number would be the daemon's socket.
-TEST(Install, StandardDescriptorsThatAreClosed) {
-    DaemonProcess daemon;
-    daemon.start();
-    const support::TemporaryDirectory place;
-    writeFile(place.path() + "/archive", makeArchive(Form::tar, {file("f")}));
-    std::vector<std::string> words = {"/bin/sh", "-c", "exec \"$@\" 0<&- 1>&- 2>&-", "sh"};
-    for (const std::string& word : installing(daemon.root(), place.path() + "/archive"))
-        words.push_back(word);
-    EXPECT_EQ(runProgram(words).exitStatus, 0);
-    EXPECT_EQ(daemon.counter("BrokenFrames"), 0);
 }
 
 // Goal: however an installation ends before its time, the old container is as it was, and nothing of the new one
@@ -225,11 +243,7 @@ TEST(Install, WhateverFailsTheOldOneStays) {
          "until the next boot", true},
         {"asked for by another", good,
          [](DaemonProcess& daemon, const Program&) {
-             EXPECT_TRUE(daemon.client().createOrLookup({.containerClass = bundleApplication,
-                                                         .user = 33,
-                                                         .identifier = identifier,
-                                                         .create = true,
-                                                         .transient = true}));
+             EXPECT_TRUE(daemon.client().createOrLookup({bundleApplication, 33, identifier, true, true}));
          },
          exitLocalError, "somebody else's", true},
     };
@@ -335,9 +349,9 @@ TEST(Install, WhatMayBeTheOnlyOneIsKept) {
     const Relay relay(daemon, [&](ipc::Command command) {
         if (command == ipc::Command::replaceContainer) {
             lost = true;
-            return Relay::Fate::hungUp;
+            return Fate::hungUp;
         }
-        return lost.exchange(false) ? Relay::Fate::hungUp : Relay::Fate::passedOn;
+        return lost.exchange(false) ? Fate::hungUp : Fate::passedOn;
     });
     Program installer(installing(relay.root(), place.path() + "/archive"));
     expectEnd(installer, exitLocalError, "cannot be told");
@@ -358,10 +372,10 @@ TEST(Install, SignalsWhileTheDaemonIsSilent) {
         std::atomic<bool> told{false};
         const Relay relay(daemon, [&, command = silentAt](ipc::Command asked) {
             if (asked != command)
-                return Relay::Fate::passedOn;
+                return Fate::passedOn;
             if (!told.exchange(true))
                 silent.set_value();
-            return Relay::Fate::unanswered;
+            return Fate::unanswered;
         });
         Program installer(installing(relay.root(), place.path() + "/archive"));
         silent.get_future().wait();

@@ -1,26 +1,20 @@
 // SPDX-License-Identifier: Apache-2.0
 // The daemon's life as its users see it: started twice, told to stop, kept short, asked by its tool.
-#include "os/FileDescriptor.h"
 #include "process/DaemonProcess.h"
-#include "process/JsonSchema.h"
+#include "support/Frames.h"
 #include "whole/Expect.h"
 
 #include <algorithm>
-#include <cerrno>
 #include <csignal>
-#include <cstring>
 #include <filesystem>
 #include <fstream>
-#include <gtest/gtest.h>
+#include <nlohmann/json.hpp>
 #include <poll.h>
 #include <sched.h>
-#include <set>
 #include <sstream>
 #include <sys/mount.h>
 #include <sys/resource.h>
-#include <sys/socket.h>
 #include <sys/syscall.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <tuple>
 #include <unistd.h>
@@ -77,13 +71,11 @@ TEST(Life, FewDescriptorsAreShared) {
     DaemonProcess daemon;
     daemon.start({}, [&] { return ::setrlimit(RLIMIT_NOFILE, &few) == 0; });
     const auto connect = [&](uid_t uid, int type, const std::string& name) {
-        sockaddr_un address{.sun_family = AF_UNIX, .sun_path = {}};
-        daemon.path("run/zorvane/" + name).copy(address.sun_path, sizeof address.sun_path - 1);
         platform::FileDescriptor socket(::socket(AF_UNIX, type | SOCK_CLOEXEC, 0));
         (void)::syscall(SYS_setresuid, -1, uid, -1);
-        const int failed = ::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address);
+        const bool connected = support::connectTo(socket.get(), daemon.path("run/zorvane/" + name));
         (void)::syscall(SYS_setresuid, -1, 0, -1);
-        EXPECT_EQ(failed, 0) << errno;
+        EXPECT_TRUE(connected) << errno;
         return socket;
     };
     std::vector<platform::FileDescriptor> idle;
@@ -119,6 +111,58 @@ TEST(Life, FilesThatMayNotGrow) {
                  [&] { return ::setrlimit(RLIMIT_FSIZE, &small) == 0; });
     EXPECT_LT(tool.wait(), 128);
     EXPECT_NE(tool.said().find(std::strerror(EFBIG)), std::string::npos) << tool.said();
+}
+
+using nlohmann::json;
+
+/// Judges a document by one of the schemas that are installed, as far as they use the language: a word of a schema that
+/// is not known here is a fault. Where and how the document differs; empty when it does not.
+std::string differenceFromSchema(const json& schema, const json& document);
+
+bool hasType(const std::string& type, const json& document) {
+    return type == (document.is_number_integer() ? "integer" : document.is_number() ? "number" : document.type_name());
+}
+
+std::string properties(const json& schema, const json& document) {
+    if (!document.is_object())
+        return {};
+    const json known = schema.value("properties", json::object());
+    for (const auto& [name, value] : document.items()) {
+        const json rule = known.contains(name) ? known[name] : schema.value("additionalProperties", json(true));
+        if (rule == json(false))
+            return name + " is not known";
+        if (const auto difference = rule.is_object() ? differenceFromSchema(rule, value) : ""; !difference.empty())
+            return name + ": " + difference;
+    }
+    return {};
+}
+
+std::string differenceFromSchema(const json& schema, const json& document) {
+    for (const auto& [word, rule] : schema.items()) {
+        std::string difference;
+        const json list = rule.is_array() ? rule : json::array({rule});
+        const auto isSo = [&](const auto& judge) { return std::any_of(list.begin(), list.end(), judge); };
+        if (word == "type")
+            difference = isSo([&](const json& type) { return hasType(type, document); }) ? "" : "is no " + rule.dump();
+        else if (word == "enum" || word == "const")
+            difference = isSo([&](const json& value) { return value == document; }) ? "" : "is not " + rule.dump();
+        else if (word == "anyOf")
+            difference =
+                isSo([&](const json& one) { return differenceFromSchema(one, document).empty(); }) ? "" : "none fits";
+        else if (word == "required")
+            difference =
+                isSo([&](const json& name) { return !document.contains(name); }) ? "not all of " + rule.dump() : "";
+        else if (word == "properties" || word == "additionalProperties")
+            difference = properties(schema, document);
+        else if (word == "items")
+            for (std::size_t i = 0; i < document.size() && difference.empty(); ++i)
+                difference = differenceFromSchema(rule, document[i]);
+        else
+            difference = "the schema says " + word;
+        if (!difference.empty())
+            return difference;
+    }
+    return {};
 }
 
 struct ToolCall {

@@ -2,19 +2,17 @@
 // zorvane-run as a service manager uses it: a real daemon, real containers, real sandboxes. What makes sandboxes needs
 // root, and a kernel that allows namespaces here.
 #include "process/DaemonProcess.h"
+#include "support/Waiting.h"
 #include "whole/Expect.h"
 
 #include <algorithm>
 #include <csignal>
 #include <fcntl.h>
 #include <filesystem>
-#include <gtest/gtest.h>
 #include <poll.h>
 #include <sys/epoll.h>
 #include <sys/file.h>
 #include <sys/socket.h>
-#include <sys/stat.h>
-#include <thread>
 
 namespace zor::whole {
 
@@ -22,6 +20,7 @@ namespace {
 
 namespace files = std::filesystem;
 using Words = std::vector<std::string>;
+using support::eventually;
 
 Words operator+(Words words, const Words& more) {
     words.insert(words.end(), more.begin(), more.end());
@@ -30,15 +29,6 @@ Words operator+(Words words, const Words& more) {
 
 const std::string notes = "org.example.notes";
 const std::string maps = "org.example.maps";
-
-bool waitUntil(const std::function<bool()>& condition) {
-    for (int tries = 0; tries < 1000; ++tries) {
-        if (condition())
-            return true;
-        std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    }
-    return false;
-}
 
 /// Why no sandbox can be made here; empty when one can.
 std::string whyNoSandbox() {
@@ -136,7 +126,7 @@ TEST(Run, AnAssertionTakenMeanwhile) {
         ::kill(launcher.daemon.pid(), SIGSTOP);
         Program run(launcher.words(notes, Words(waits ? 1 : 0, "--wait") + Words{"--", "sh", "-c", "echo $HOME"}));
         const std::string descriptors = "/proc/" + std::to_string(run.pid()) + "/fd";
-        EXPECT_TRUE(waitUntil([&] {
+        EXPECT_TRUE(eventually([&] {
             return std::ranges::any_of(files::directory_iterator(descriptors), [](const auto& entry) {
                 std::error_code error;
                 return files::read_symlink(entry, error).string().starts_with("socket:");
@@ -299,7 +289,7 @@ TEST(Run, ExitCodesAndSignals) {
     const auto signalled = [&](const Words& words, int signal) {
         files::remove(ready);
         Program run(launcher.words(notes, words));
-        EXPECT_TRUE(waitUntil([&] { return files::exists(ready); }));
+        EXPECT_TRUE(eventually([&] { return files::exists(ready); }));
         run.signal(signal);
         const int exitCode = run.wait();
         return Outcome{exitCode, run.said()};
@@ -344,7 +334,7 @@ TEST(Run, NothingOutlivesTheLauncher) {
         if (moment < moments)
             std::this_thread::sleep_for(std::chrono::microseconds(600 * moment));
         else
-            EXPECT_TRUE(waitUntil([&] { return files::exists(ready); }));
+            EXPECT_TRUE(eventually([&] { return files::exists(ready); }));
         run.signal(SIGKILL);
         EXPECT_EQ(run.wait(), 128 + SIGKILL);
         pollfd end{.fd = ends[0], .events = 0, .revents = 0};

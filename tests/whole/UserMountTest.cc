@@ -6,7 +6,6 @@
 #include <atomic>
 #include <chrono>
 #include <gtest/gtest.h>
-#include <thread>
 
 namespace zor::whole {
 
@@ -42,8 +41,6 @@ bool serves(const DaemonProcess& daemon, uid_t user) {
 /// Each kind of request about the container, all answered.
 void expectAnswers(const DaemonProcess& daemon, const zorvane::Client::Address& app) {
     using C = zorvane::Client&;
-    const zorvane::Client::ProtectionChange protection{
-        .containerClass = dataApplication, .user = mobile, .identifier = "app", .protectionClass = 1};
     const Asks requests[] = {
         [](C client) { return come(client.createOrLookup(dataContainer("app"))); },
         [](C client) { return come(client.createOrLookup(dataContainer("new"))); },
@@ -52,7 +49,7 @@ void expectAnswers(const DaemonProcess& daemon, const zorvane::Client::Address& 
         [&](C client) { return come(client.diskUsage(app)); },
         [&](C client) { return come(client.recreateDefaultStructure(app)); },
         [&](C client) { return come(client.setInfoValue(app, "k", zorvane::Value{true})); },
-        [&](C client) { return come(client.setDataProtection(protection)); },
+        [&](C client) { return come(client.setDataProtection({dataApplication, mobile, "app", 1})); },
         [](C client) { return come(client.processEntitlements({.identifier = "app"})); },
         [](C client) { return come(client.wipe(dataApplication, mobile, "app")); },
         [&](C client) { return come(client.stageForDelete({app})); },
@@ -103,8 +100,7 @@ TEST(UserMount, KeepsNobodyWaiting) {
                 std::this_thread::sleep_for(std::chrono::milliseconds(20));
             }
         });
-        expectAnswers(daemon,
-                      {.containerClass = dataApplication, .user = mobile, .identifier = "app", .uuid = made.uuid});
+        expectAnswers(daemon, {dataApplication, mobile, "app", made.uuid});
         ended = true;
         lookups.join();
         EXPECT_LT(secondsOf([&] { EXPECT_EQ(daemon.terminate(), 0); }), patienceSeconds);

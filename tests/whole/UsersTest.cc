@@ -10,8 +10,6 @@
 #include <algorithm>
 #include <csignal>
 #include <filesystem>
-#include <gtest/gtest.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 namespace zor::whole {

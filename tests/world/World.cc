@@ -3,10 +3,6 @@
 
 #include "plist/Binary.h"
 
-#include <algorithm>
-#include <cstdio>
-#include <filesystem>
-#include <future>
 #include <sched.h>
 #include <stdexcept>
 #include <sys/mount.h>
@@ -85,10 +81,6 @@ World::~World() {
     platform_->finish();
 }
 
-platform::WorkQueue& World::deathRowQueue() {
-    return options_.disk ? immediately_ : platform_->roles().deathRowQueue;
-}
-
 void World::start() {
     auto opened = platform::LinuxPlatform::open({.rootDirectory = path(), .syncs = options_.syncs});
     require(opened.has_value(), "no platform");
@@ -112,77 +104,6 @@ void World::restart() {
     start();
 }
 
-std::shared_ptr<ZORClientConnection> World::client(ZORClientConnection::Client client) {
-    return std::make_shared<ZORClientConnection>(composition_->store(), std::move(client));
-}
-
-void World::boot() {
-    daemonsClient().rebootContainerManagerSetup();
-    launch();
-}
-
-void World::launch() {
-    daemonsClient().containerManagerSetup();
-    drainDeathRow();
-}
-
-ErrorCode World::pass() {
-    std::promise<ErrorCode> code;
-    daemonsClient().deleteContainersOnDeathRowWithCompletion([&](ErrorCode c) { code.set_value(c); });
-    const ErrorCode result = code.get_future().get();
-    drainDeathRow();
-    return result;
-}
-
-Result<FoundContainer> World::create(const std::string& identifier, ContainerClass containerClass, bool transient,
-                                     std::optional<std::uint32_t> userId) {
-    return daemonsClient().createOrLookupContainerForUser(userId.value_or(ownerOf(containerClass)), &identifier,
-                                                          containerClass,
-                                                          {.createIfNecessary = true, .transient = transient});
-}
-
-Result<FoundContainer> World::find(const std::string& identifier, ContainerClass containerClass, bool transient) {
-    return daemonsClient().createOrLookupContainerForUser(ownerOf(containerClass), &identifier, containerClass,
-                                                          {.transient = transient});
-}
-
-ErrorCode World::entitle(const std::string& identifier, const std::optional<plist::Dictionary>& entitlements,
-                         const plist::Dictionary& options) {
-    return composition_->store().entitlementChange.processEntitlements(entitlements ? &*entitlements : nullptr,
-                                                                       &identifier, &options);
-}
-
-ErrorCode World::stage(const FoundContainer& container) {
-    const ZORMetadata& record = *container.record;
-    return codeOf(daemonsClient().stageForDeleteContainersWithUsers(
-        ZORClientConnection::DeletionBatch::of(record.uid(), container.uuid, record.identifier(),
-                                               record.containerClass()),
-        UseLocking::yes));
-}
-
-void World::move(const std::string& from, const std::string& to) const {
-    std::filesystem::rename(at(from), at(to));
-}
-
-void World::link(const std::string& target, const std::string& place) const {
-    std::filesystem::create_symlink(target, at(place));
-}
-
-void World::drainDeathRow() {
-    std::promise<void> reached;
-    deathRowQueue().async([&] { reached.set_value(); });
-    reached.get_future().wait();
-}
-
-std::vector<std::string> World::deathRow() const {
-    std::vector<std::string> found;
-    for (const std::string& unique : names(dead))
-        for (std::string& name : names(dead + "/" + unique))
-            found.push_back(std::move(name));
-    std::ranges::sort(found);
-    return found;
-}
-
 void World::putContainer(std::string_view relative, const plist::Dictionary& metadata) const {
     makeDirectories(relative);
     write(std::string(relative) + "/" + names::metadataFile, binary(metadata));
@@ -202,22 +123,6 @@ void World::putJournal(const std::string& name, const std::array<std::string, 4>
     write(journals + "/" + name + ".plist", binary(content));
 }
 
-void World::refuse(support::DiskCall call, int error, support::FaultSpan span) {
-    faults_.arm({.error = error, .span = span, .filter = [call](const support::DiskCallInfo& info) {
-                     return info.call == call;
-                 }});
-}
-
-std::vector<std::string> World::complaints(std::string_view function) {
-    std::vector<std::string> messages = log.take(3, function);
-    std::ranges::transform(messages, messages.begin(), support::withoutSourceLine);
-    return messages;
-}
-
-std::uint32_t ownerOf(ContainerClass containerClass) {
-    return isBundleClass(containerClass) ? 33 : isSystemClass(containerClass) ? 499 : mobile;
-}
-
 Result<void> World::replace(const FoundContainer* old, const FoundContainer& fresh,
                             ZORClientConnection::PreserveOldUUID preserve) {
     ZORClientConnection::ReplaceRequest request{.newUuid = fresh.uuid,
@@ -232,27 +137,6 @@ Result<void> World::replace(const FoundContainer* old, const FoundContainer& fre
         request.classOld = old->record->containerClass();
     }
     return daemonsClient().replaceContainer(request, StartDeletionThread::no);
-}
-
-ZORClientConnection::ContainerAddress addressOf(const FoundContainer& container) {
-    const ZORMetadata& record = *container.record;
-    return {record.uid(), container.uuid, record.identifier(), record.containerClass()};
-}
-
-std::string nameOf(const std::string& path) {
-    return path.substr(path.rfind('/') + 1);
-}
-
-std::string parentOf(const std::string& path) {
-    return path.substr(0, path.rfind('/'));
-}
-
-plist::Dictionary metadataOf(std::uint64_t containerClass, std::uint32_t userId, const std::string& identifier,
-                             const std::string& uuid) {
-    return {{"ZORMetadataContentClass", containerClass},
-            {"ZORMetadataPersona", userId},
-            {"ZORMetadataIdentifier", identifier},
-            {"ZORMetadataUUID", uuid}};
 }
 
 std::string binary(const plist::Value& value) {

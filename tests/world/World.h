@@ -16,17 +16,11 @@
 #include "support/RecordingLog.h"
 #include "support/SettableRoles.h"
 #include "support/TestRoot.h"
+#include "support/Waiting.h"
 
 #include <array>
-#include <atomic>
-#include <functional>
+#include <future>
 #include <memory>
-#include <optional>
-#include <string>
-#include <string_view>
-#include <sys/stat.h>
-#include <thread>
-#include <vector>
 
 namespace zor::test {
 
@@ -35,8 +29,23 @@ inline constexpr std::uint32_t second = 502;
 inline constexpr ContainerClass application = ContainerClass::dataApplication;
 inline constexpr bool asTransient = true;
 
+inline constexpr const char* cachesPath = "private/var/root/Library/Caches/com.veltra.zorvaned";
+inline constexpr const char* libraryPath = "private/var/root/Library/Zorvane";
+/// On any device that has been booted: no group identifiers of an older system wait in containers.
+inline constexpr const char* groupMarkerPath = "private/var/root/Library/Zorvane/zor_group_id_migration_complete.plist";
+inline constexpr const char* sharedPath = "private/var/containers";
+inline constexpr const char* mobileContainers = "private/var/mobile/Containers";
+inline constexpr const char* mobileCaches = "private/var/mobile/Containers/Library/Caches/com.veltra.zorvaned";
+inline const std::string applications = std::string(mobileContainers) + "/Data/Application";
+inline const std::string transients = std::string(mobileCaches) + "/Temp/Data/Application";
+inline const std::string staging = std::string(cachesPath) + "/Staging";
+inline const std::string dead = std::string(cachesPath) + "/Dead";
+inline const std::string journals = std::string(libraryPath) + "/Replace";
+inline const std::string entitlementFile = std::string(libraryPath) + "/zor_entitlements.plist";
+
 using support::FlagBootMarker;
 using support::furnish;
+using support::inThreads;
 using support::itemAt;
 
 /// Counts what the queue behind it is told.
@@ -93,7 +102,6 @@ public:
     explicit MountedHome(const std::string& root);
     ~MountedHome();
     MountedHome(const MountedHome&) = delete;
-    MountedHome& operator=(const MountedHome&) = delete;
     /// Only root may have the namespace.
     static bool canBe();
     [[nodiscard]] bool mounted() const { return mounted_; }
@@ -102,6 +110,20 @@ private:
     const std::string path_;
     const bool mounted_;
 };
+
+/// The user whose containers of a class the tests make.
+inline std::uint32_t ownerOf(ContainerClass containerClass) {
+    return isBundleClass(containerClass) ? 33 : isSystemClass(containerClass) ? 499 : mobile;
+}
+
+/// Of one of the system's errors the code is negative.
+inline ErrorCode codeOf(const ZORError& error) {
+    return error.domain() == ErrorDomain::zor ? error.replyCode() : static_cast<ErrorCode>(-error.code());
+}
+template <typename T>
+ErrorCode codeOf(const Result<T>& result) {
+    return result ? ErrorCode::success : codeOf(result.error());
+}
 
 class World : public support::TestRoot {
 public:
@@ -119,8 +141,6 @@ public:
     World() : World(Options()) {}
     explicit World(Options options);
     ~World();
-    World(const World&) = delete;
-    World& operator=(const World&) = delete;
 
     /// Ends the daemon's services and makes new ones, as a launch after a stop does. The disk stays.
     void restart();
@@ -129,11 +149,19 @@ public:
     /// Reads what the services are made from, as they do when they are first asked for.
     void load() { (void)composition_->store(); }
     /// A client of one message.
-    [[nodiscard]] std::shared_ptr<ZORClientConnection> client(ZORClientConnection::Client client);
+    [[nodiscard]] std::shared_ptr<ZORClientConnection> client(ZORClientConnection::Client client) {
+        return std::make_shared<ZORClientConnection>(composition_->store(), std::move(client));
+    }
     [[nodiscard]] platform::LinuxPlatform& linux() { return *platform_; }
     /// What a boot does before it serves; a launch without one does the second half.
-    void boot();
-    void launch();
+    void boot() {
+        daemonsClient().rebootContainerManagerSetup();
+        launch();
+    }
+    void launch() {
+        daemonsClient().containerManagerSetup();
+        drainDeathRow();
+    }
     void reboot() {
         restart();
         boot();
@@ -143,15 +171,32 @@ public:
         launch();
     }
     /// Waits until everything queued for death row has run.
-    void drainDeathRow();
+    void drainDeathRow() {
+        std::promise<void> reached;
+        deathRowQueue().async([&] { reached.set_value(); });
+        reached.get_future().wait();
+    }
     /// The code of one deletion pass.
-    ErrorCode pass();
+    ErrorCode pass() {
+        std::promise<ErrorCode> code;
+        daemonsClient().deleteContainersOnDeathRowWithCompletion([&](ErrorCode c) { code.set_value(c); });
+        const ErrorCode result = code.get_future().get();
+        drainDeathRow();
+        return result;
+    }
 
     // Containers, by the daemon's own client; of mobile where the class does not say whose they are.
     Result<FoundContainer> create(const std::string& identifier, ContainerClass containerClass = application,
-                                  bool transient = false, std::optional<std::uint32_t> userId = {});
+                                  bool transient = false, std::optional<std::uint32_t> userId = {}) {
+        return daemonsClient().createOrLookupContainerForUser(userId.value_or(ownerOf(containerClass)), &identifier,
+                                                              containerClass,
+                                                              {.createIfNecessary = true, .transient = transient});
+    }
     Result<FoundContainer> find(const std::string& identifier, ContainerClass containerClass = application,
-                                bool transient = false);
+                                bool transient = false) {
+        return daemonsClient().createOrLookupContainerForUser(ownerOf(containerClass), &identifier, containerClass,
+                                                              {.transient = transient});
+    }
     FoundContainer make(const std::string& identifier, ContainerClass containerClass = application,
                         bool transient = false, std::optional<std::uint32_t> userId = {}) {
         return create(identifier, containerClass, transient, userId).value();
@@ -159,17 +204,35 @@ public:
 
     /// What a registration is answered with; without entitlements it ends one.
     ErrorCode entitle(const std::string& identifier, const std::optional<plist::Dictionary>& entitlements,
-                      const plist::Dictionary& options = {});
+                      const plist::Dictionary& options = {}) {
+        return composition_->store().entitlementChange.processEntitlements(entitlements ? &*entitlements : nullptr,
+                                                                           &identifier, &options);
+    }
     /// What the deletion of one container is answered with.
-    ErrorCode stage(const FoundContainer& container);
+    ErrorCode stage(const FoundContainer& container) {
+        const ZORMetadata& record = *container.record;
+        return codeOf(daemonsClient().stageForDeleteContainersWithUsers(
+            ZORClientConnection::DeletionBatch::of(record.uid(), container.uuid, record.identifier(),
+                                                   record.containerClass()),
+            UseLocking::yes));
+    }
 
     // The disk below the root; paths are relative to it, or begin with it.
-    void move(const std::string& from, const std::string& to) const;
-    void link(const std::string& target, const std::string& place) const;
+    void move(const std::string& from, const std::string& to) const { std::filesystem::rename(at(from), at(to)); }
+    void link(const std::string& target, const std::string& place) const {
+        std::filesystem::create_symlink(target, at(place));
+    }
     [[nodiscard]] FileURL url(std::string_view relative) const { return FileURL::directory(path(relative)); }
     [[nodiscard]] std::string relative(const std::string& absolute) const { return absolute.substr(path().size() + 1); }
     /// What is under death row's unique directories, sorted.
-    [[nodiscard]] std::vector<std::string> deathRow() const;
+    [[nodiscard]] std::vector<std::string> deathRow() const {
+        std::vector<std::string> found;
+        for (const std::string& unique : names(dead))
+            for (std::string& name : names(dead + "/" + unique))
+                found.push_back(std::move(name));
+        std::ranges::sort(found);
+        return found;
+    }
 
     /// The new one takes the old one's place; nullptr: that of none.
     Result<void> replace(const FoundContainer* old, const FoundContainer& fresh,
@@ -189,9 +252,17 @@ public:
     FailingSandbox sandbox;
     support::FaultDisk& disk() { return faults_; }
     /// The disk refuses calls of one kind until it is disarmed.
-    void refuse(support::DiskCall call, int error, support::FaultSpan span = support::FaultSpan::once);
+    void refuse(support::DiskCall call, int error, support::FaultSpan span = support::FaultSpan::once) {
+        faults_.arm({.error = error, .span = span, .filter = [call](const support::DiskCallInfo& info) {
+                         return info.call == call;
+                     }});
+    }
     /// The level-3 messages of a function since the last look at the log, without their source lines.
-    std::vector<std::string> complaints(std::string_view function);
+    std::vector<std::string> complaints(std::string_view function) {
+        std::vector<std::string> messages = log.take(3, function);
+        std::ranges::transform(messages, messages.begin(), support::withoutSourceLine);
+        return messages;
+    }
     /// Classes under the lock state in the test's hand.
     platform::XattrProtectionClass& protection() { return *protection_; }
 
@@ -200,7 +271,9 @@ private:
         return place.starts_with('/') ? place : path(place);
     }
     void start();
-    [[nodiscard]] platform::WorkQueue& deathRowQueue();
+    [[nodiscard]] platform::WorkQueue& deathRowQueue() {
+        return options_.disk ? immediately_ : platform_->roles().deathRowQueue;
+    }
 
     const Options options_;
     platform::LinuxDisk realDisk_;
@@ -213,26 +286,28 @@ private:
 };
 
 /// The content of a metadata file.
-plist::Dictionary metadataOf(std::uint64_t containerClass, std::uint32_t userId, const std::string& identifier,
-                             const std::string& uuid = "00000000-0000-4000-8000-000000000001");
+inline plist::Dictionary metadataOf(std::uint64_t containerClass, std::uint32_t userId, const std::string& identifier,
+                                    const std::string& uuid = "00000000-0000-4000-8000-000000000001") {
+    return {{"ZORMetadataContentClass", containerClass},
+            {"ZORMetadataPersona", userId},
+            {"ZORMetadataIdentifier", identifier},
+            {"ZORMetadataUUID", uuid}};
+}
 std::string binary(const plist::Value& value);
-ZORClientConnection::ContainerAddress addressOf(const FoundContainer& container);
-/// The user whose containers of a class the tests make.
-std::uint32_t ownerOf(ContainerClass containerClass);
-std::string nameOf(const std::string& path);
-std::string parentOf(const std::string& path);
+inline ZORClientConnection::ContainerAddress addressOf(const FoundContainer& container) {
+    const ZORMetadata& record = *container.record;
+    return {record.uid(), container.uuid, record.identifier(), record.containerClass()};
+}
+inline std::string nameOf(const std::string& path) {
+    return path.substr(path.rfind('/') + 1);
+}
+inline std::string parentOf(const std::string& path) {
+    return path.substr(0, path.rfind('/'));
+}
 inline bool isThere(const std::string& path) {
     return itemAt(path) != "missing";
 }
 
-/// Of one of the system's errors the code is negative.
-inline ErrorCode codeOf(const ZORError& error) {
-    return error.domain() == ErrorDomain::zor ? error.replyCode() : static_cast<ErrorCode>(-error.code());
-}
-template <typename T>
-ErrorCode codeOf(const Result<T>& result) {
-    return result ? ErrorCode::success : codeOf(result.error());
-}
 /// The code and the description: "11 Can't act on". Empty for a success.
 template <typename T>
 std::string complaintOf(const Result<T>& result) {
@@ -240,27 +315,5 @@ std::string complaintOf(const Result<T>& result) {
                   : std::to_string(static_cast<std::int64_t>(codeOf(result))) + " " +
                         result.error().description().value_or("(null)");
 }
-
-/// Runs body(0) to body(count - 1) at once, each on a thread of its own.
-template <typename Body>
-void inParallel(int count, Body body) {
-    std::vector<std::jthread> threads;
-    for (int i = 0; i < count; ++i)
-        threads.emplace_back([&body, i] { body(i); });
-}
-
-inline constexpr const char* cachesPath = "private/var/root/Library/Caches/com.veltra.zorvaned";
-inline constexpr const char* libraryPath = "private/var/root/Library/Zorvane";
-/// On any device that has been booted: no group identifiers of an older system wait in containers.
-inline constexpr const char* groupMarkerPath = "private/var/root/Library/Zorvane/zor_group_id_migration_complete.plist";
-inline constexpr const char* sharedPath = "private/var/containers";
-inline constexpr const char* mobileContainers = "private/var/mobile/Containers";
-inline constexpr const char* mobileCaches = "private/var/mobile/Containers/Library/Caches/com.veltra.zorvaned";
-inline const std::string applications = std::string(mobileContainers) + "/Data/Application";
-inline const std::string transients = std::string(mobileCaches) + "/Temp/Data/Application";
-inline const std::string staging = std::string(cachesPath) + "/Staging";
-inline const std::string dead = std::string(cachesPath) + "/Dead";
-inline const std::string journals = std::string(libraryPath) + "/Replace";
-inline const std::string entitlementFile = std::string(libraryPath) + "/zor_entitlements.plist";
 
 } // namespace zor::test
