@@ -119,7 +119,7 @@ std::optional<plist::Value> ZOREntitlementMapping::_onQueue_store(const std::str
     const plist::Value* const current = entitlementMappingDict_.find(key);
     std::optional<plist::Value> before = current ? std::optional(*current) : std::nullopt;
     const auto held = [&](const std::optional<plist::Value>& one) {
-        return one ? sizeof key + key.size() + plist::heldBytes(*one) : 0;
+        return one ? sizeof(std::string) + key.size() + plist::heldBytes(*one) : 0;
     };
     const std::size_t bytes = heldBytes_ - held(before) + held(value);
     if (value)
