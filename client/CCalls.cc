@@ -250,7 +250,7 @@ std::uint32_t zorvane_default_user(std::uint32_t container_class, const char* ro
 }
 
 void zorvane_uuid_text(const std::uint8_t uuid[16], char text[37]) {
-    // Of 36 characters, more than a string keeps in itself.
+    // The text has 36 characters, more than a string keeps in itself.
     text[0] = '\0';
     (void)c::guardedOr(0, [&] {
         zorvane_uuid bytes;

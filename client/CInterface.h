@@ -71,7 +71,7 @@ struct Wrong {
 int tell(zorvane_error* error, const Error& failure) noexcept;
 int tell(zorvane_error* error, const char* message) noexcept;
 
-/// What `body` returns; what it throws becomes the caller's error, and its kind the answer.
+/// Gives `body`'s result; an exception of it becomes the caller's error, and its kind the answer.
 template <typename Body>
 int guarded(zorvane_error* error, Body&& body) noexcept {
     try {
@@ -85,7 +85,7 @@ int guarded(zorvane_error* error, Body&& body) noexcept {
     }
 }
 
-/// What `body` returns, or `otherwise` when it throws.
+/// Gives `body`'s result, or `otherwise` when it throws.
 template <typename T, typename Body>
 T guardedOr(T otherwise, Body&& body) noexcept {
     try {

@@ -47,7 +47,7 @@ private:
     /// Whether a time limit or an interruption ends a wait: then it is poll that waits.
     [[nodiscard]] bool pollWaits() const { return deadline_ || options_.interruptDescriptor >= 0; }
     Result<void> waitFor(short events);
-    /// What a connect may take before it is tried again; 0 is for ever.
+    /// The time for a connect before it is tried again; 0 is for ever.
     [[nodiscard]] std::uint32_t connectMilliseconds() const;
 
     zor::platform::FileDescriptor socket_;

@@ -11,7 +11,7 @@ work="$(readlink -m "${2:?work folder}")"
 cd "$(dirname "$(readlink -f "${BASH_SOURCE[0]}")")/.."
 base="$work/base"
 root="$work/root"
-# What the unit may expose, in tenths, as systemd-analyze counts.
+# The most that the unit may expose, in tenths, as systemd-analyze counts.
 exposureMax=24
 
 if [[ -z "${ZORVANE_PACKAGE_TEST:-}" ]]; then
@@ -120,7 +120,7 @@ if [[ -n "$first" ]]; then
     inside "systemd-analyze security --offline=true --threshold=$exposureMax zorvaned.service >/dev/null" || fail "the unit exposes more than it did"
 fi
 
-# What users keep, by name, owner and content.
+# The files of users, by name, owner and content.
 kept() {
     (cd "$root" && find home private/var/containers private/var/root/Library/Zorvane -type f -printf '%p %U %m\n' -exec sha256sum {} + | sort)
 }

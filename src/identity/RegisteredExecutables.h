@@ -31,7 +31,8 @@ public:
     struct Found {
         /// The regular file that the path names; links are followed.
         std::optional<FileId> file;
-        /// Where a change of that would be told: beside the path, and beside the file that its last link names.
+        /// The places where a change of that would be told: beside the path, and beside the file that its last link
+        /// names.
         std::vector<Watch> watches;
         /// False when one of them is not watched.
         bool watchedAll = false;

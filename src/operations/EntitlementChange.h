@@ -65,7 +65,7 @@ public:
 private:
     /// The same of any change. Code 59.
     ErrorCode settle(Change change) ZOR_EXCLUDES(unsyncedMutex_);
-    /// What prepareRemoval does, for a change of one identifier.
+    /// Does the same as prepareRemoval, for a change of one identifier.
     void prepare(const std::string& identifier);
     std::vector<std::string> withChildren(const std::string& identifier) const;
     void sayIfNotCleared(const std::string& identifier, ErrorCode code) const;

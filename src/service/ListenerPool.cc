@@ -25,7 +25,7 @@ namespace {
 
 constexpr std::uint64_t phaseMask = 3;
 constexpr std::uint64_t oneTask = 4;
-/// Whoever asked waits for the answer, which takes microseconds: a worker that is woken runs at once, and not when the
+/// The peer waits for the answer, which takes microseconds: a worker that is woken runs at once, and not when the
 /// peer that woke it has used up its time. A tenth of a round trip on one processor.
 constexpr int workerNice = -5;
 /// A burst is seen in a few looks; more would be stack that is rarely used.

@@ -123,7 +123,7 @@ Result<ZORContainerCache::ClassCache*> ZORContainerCache::_getCacheForUserId(con
         const std::uint64_t serial = before ? before->serial : 0;
         const std::uint64_t drops = drops_;
         ClassCache built = TRY(readUnlocked(key, [&] { return readClassDirectory(key); }));
-        // What an operation has done to the class since is not in what was read, or not as it is.
+        // An operation's later change of the class is not in what was read, or not as it is.
         const ClassCache* const now = knownCache(key);
         if (drops != drops_ || (now ? now->serial : 0) != serial)
             continue;
@@ -482,7 +482,7 @@ bool ZORContainerCache::buildAllOfUser(std::uint32_t userId) {
             const Key key{userId, static_cast<ContainerClass>(number), transient};
             if (!configuration_.users().mayOwn(key.containerClass, userId))
                 continue;
-            // What cannot be read holds nothing in memory either.
+            // A class that cannot be read holds nothing in memory either.
             const int failure = lookForDirectory(key);
             if (failure == 0) {
                 const MutexLock held(cacheLock_);

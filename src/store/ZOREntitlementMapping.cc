@@ -197,7 +197,7 @@ Result<void> ZOREntitlementMapping::save(Change change, const std::function<void
     auto written = _writeEntitlementMappingToDisk(map);
     const MutexLock held(entitlementQueue_);
     if (!written) {
-        // Who was told that nothing is due asks again.
+        // Threads that were told that nothing is due ask again.
         generation_.fetch_add(1, std::memory_order_acq_rel);
         owed_ = std::max(owed_, last);
         log_.write(logLevelError, setFunction, "Error writing entitlement mappings to disk after set : %s",
@@ -439,7 +439,7 @@ Result<void> ZOREntitlementMapping::uniteEntitlements(const std::string& identif
 bool ZOREntitlementMapping::groupIdsAreMigrated() {
     if (groupIdsAreMigrated_ || markers_.existsMigrationFileWithName(names::groupIdMigrationMarker))
         return true;
-    // Where that user is not, the lists can never be fetched, and there is never a marker.
+    // Without that user the lists can never be fetched, and there is never a marker.
     return configuration_.homeOf(configuration_.users().first)->look().state == UserHome::State::noAccount;
 }
 

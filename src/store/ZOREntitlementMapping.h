@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What each identifier is entitled to: the persistent map from which every decision about shared containers is made.
+// The entitlements of each identifier: the persistent map from which every decision about shared containers is made.
 //
 // One file, loaded once, written whole. The map is touched only on the entitlement queue, which public operations enter
 // synchronously; it is a mutex here, since nothing ever runs on it by itself, and nobody waits for the disk on it.
@@ -65,8 +65,8 @@ public:
     [[nodiscard]] plist::Dictionary entitlementMappingDict() ZOR_EXCLUDES(entitlementQueue_);
     [[nodiscard]] std::size_t entryCount() ZOR_EXCLUDES(entitlementQueue_);
 
-    /// What registering, changing or (`entitlements` nullptr) removing the entitlements of one identifier would store
-    /// and release. Holds as long as nobody changes the map.
+    /// All that registering, changing or (`entitlements` nullptr) removing the entitlements of one identifier would
+    /// store and release. Holds as long as nobody changes the map.
     struct Plan {
         std::string identifier;
         // To be stored, in this order.
@@ -126,7 +126,7 @@ public:
     /// This process has done that migration, whether or not it could be marked as done.
     void setGroupIdsMigrated(bool migrated) { groupIdsAreMigrated_ = migrated; }
 
-    /// Where an entitlement file that could not be read lies, while it does. Asked of the disk each time.
+    /// The place of an entitlement file that could not be read, while it lies there. Asked of the disk each time.
     [[nodiscard]] std::optional<FileURL> lostFile();
 
 private:

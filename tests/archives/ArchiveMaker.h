@@ -21,7 +21,7 @@ struct Made {
     std::int64_t hole = 0;
 };
 
-/// What the archive library calls it.
+/// The archive library's name for it.
 struct Form {
     int format;
     int filter = ARCHIVE_FILTER_NONE;

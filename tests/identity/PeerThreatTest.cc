@@ -17,7 +17,7 @@ bool putOver(const std::string& at, const std::string& shown) {
            ::mount(shown.c_str(), at.c_str(), nullptr, MS_BIND, nullptr) == 0;
 }
 
-/// Of a child that exits with it.
+/// The exit status of a child.
 int exitStatusOf(pid_t child) {
     int status = 0;
     ::waitpid(child, &status, 0);

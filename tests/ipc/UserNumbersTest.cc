@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What a configuration of users is taken for, and why one is refused: each text against a small user database.
+// The meaning of a configuration of users, and why one is refused: each text against a small user database.
 #include "ipc/UserNumbers.h"
 
 #include <cerrno>

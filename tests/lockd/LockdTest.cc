@@ -27,7 +27,7 @@ struct Session {
     bool hint = false;
 };
 
-/// What a login service answers and says, on a bus of the test's own.
+/// A login service's answers and signals, on a bus of the test's own.
 class LoginService {
 public:
     explicit LoginService(const std::string& address) : bus_(connected(address)) {

@@ -25,7 +25,7 @@ Data operator+(Data left, const Data& right) {
     return left;
 }
 
-/// Where a trailer says something else than the truth.
+/// The place in a trailer that says something else than the truth.
 struct Frame {
     std::uint64_t root = 0;
     std::size_t offsetWidth = 1;

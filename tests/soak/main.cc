@@ -140,7 +140,7 @@ int soak(const Options& options) {
     for (std::thread& thread : threads)
         thread.join();
     surroundings.check();
-    // What ended in the middle of things has left nothing behind.
+    // Clients and daemons that ended in the middle of things have left nothing behind.
     for (const char* counter : {"LockedIdentifiers", "BufferedInputBytes", "BufferedOutputBytes"})
         if (daemon.counter(counter) != 0)
             session.found(std::string(counter) + " is " + std::to_string(daemon.counter(counter)));

@@ -322,7 +322,7 @@ TEST_F(Shared, SystemContainersAndGroups) {
         EXPECT_EQ(path != nullptr && isThere(*path), row.code == 1);
         EXPECT_EQ(reply.size(), row.code == 1 ? 2U : 1U);
     }
-    // What cannot be made is not found, whatever the reason.
+    // A container that cannot be made is not found, whatever the reason.
     asClient("newcomer", {{systemGroups, Array{"systemgroup.n"}}});
     (void)request({{"Command", 13}, {"UserID", 1}}); // registers
     world.refuse(DiskCall::rename, EIO);

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
-// What a change of entitlements makes of the map and its file, of system containers and of groups; reconciliation; what
-// a lost file keeps from being deleted; and the files of the map and of the table of well-known containers, damaged,
-// foreign, or such that cannot be written.
+// The effects of a change of entitlements on the map and its file, of system containers and of groups; reconciliation;
+// what a lost file keeps from being deleted; and the files of the map and of the table of well-known containers,
+// damaged, foreign, or such that cannot be written.
 #include "operations/ZORGroupManager.h"
 #include "store/ZOREntitlementMapping.h"
 #include "world/World.h"
@@ -315,7 +315,7 @@ TEST(EntitlementMapping, AnUnreadableFileIsKeptAside) {
         world.load();
     }
     EXPECT_EQ(world.read(aside), "first loss");
-    // Who accepts the first loss has not seen the second.
+    // An administrator who accepts the first loss has not seen the second.
     std::filesystem::remove(world.path(aside));
     EXPECT_EQ(world.services().entitlements().lostFile(), FileURL::file(world.path(entitlementFile)));
     ASSERT_EQ(save(world), ErrorCode::success);

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the first launch of a boot makes of an older system: its bundles, well-known containers and group identifiers.
+// The first launch of a boot over an older system: its bundles, well-known containers and group identifiers.
 #include "daemon/Daemon.h"
 #include "world/World.h"
 

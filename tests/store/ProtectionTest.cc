@@ -20,7 +20,7 @@ const std::string key = "com.veltra.Brevance.ContentProtectionClass";
 const std::string identifier = "com.example.app";
 const std::string assertionFile = "run/zorvane/assertions/com.example.app";
 
-/// What a completion was told; a second answer throws.
+/// The outcome that a completion was told; a second answer throws.
 class Answers {
 public:
     ZORDataProtectionManager::Completion completion() {

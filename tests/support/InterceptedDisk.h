@@ -43,7 +43,7 @@ struct DiskCallInfo {
     [[nodiscard]] std::string describe() const;
 };
 
-/// What a loop over fault points or power cuts found. An empty complaint is a pass.
+/// The findings of a loop over fault points or power cuts. An empty complaint is a pass.
 struct LoopReport {
     /// Points or states that were judged.
     std::size_t examined = 0;

@@ -28,7 +28,7 @@ struct LoggedOperation {
     /// A rename's destination.
     InodeId toDirectory = 0;
     std::string toName;
-    /// What a rename replaced, or exchanged it with.
+    /// The item that a rename replaced, or exchanged.
     InodeId replaced = 0;
     bool exchanges = false;
     /// The state given to a new inode; the mode or the owner that a change sets; the bytes of a write.

@@ -55,7 +55,7 @@ constexpr ContainerKind kinds[] = {
     {13, "Shared/SystemGroup", system, 499, 0, inGroups, 0777},
 };
 
-/// What is wrong with the kind, mode or owner of an item; empty when nothing is. Only root can give things to others.
+/// The fault in the kind, mode or owner of an item; empty when nothing is. Only root can give things to others.
 std::string itemComplaint(const FileTree& tree, const std::string& path, mode_t kindAndMode, std::uint32_t owner) {
     const InodeId id = tree.resolve(path);
     const Inode& inode = tree.inodes.at(id == 0 ? FileTree::rootId : id);

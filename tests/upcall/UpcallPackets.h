@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the kernel's agent sends and what comes back, item by item.
+// The packets of the kernel's agent and their answers, item by item.
 #pragma once
 
 #include "upcall/packbuff/Packbuff.h"

@@ -46,7 +46,7 @@ void install(const DaemonProcess& daemon, const std::string& source) {
     ASSERT_EQ(done.exitStatus, 0) << done.output;
 }
 
-/// What becomes of a request: it reaches the daemon; nothing comes for ten seconds, or until the client goes, and then
+/// The fate of a request: it reaches the daemon; nothing comes for ten seconds, or until the client goes, and then
 /// the connection ends; it ends at once.
 enum class Fate { passedOn, unanswered, hungUp };
 
@@ -206,7 +206,7 @@ TEST(Install, DirectoryThenArchive) {
         EXPECT_FALSE(std::filesystem::exists(path) || std::filesystem::exists(newPath + "/link"));
         EXPECT_TRUE(isGone(daemon));
     }
-    // What is said does not go into the daemon's socket, which gets the third number.
+    // A message does not go into the daemon's socket, which gets the third number.
     expectOutcome(throughShell("exec \"$@\" 0<&- 1>&- 2>&-", installing(daemon.root(), archive)), 0, "");
     EXPECT_EQ(daemon.counter("BrokenFrames"), 0);
     for (const auto& [source, whereTo] : {std::pair("/nowhere", "1"), std::pair("/etc", "shared-app")})

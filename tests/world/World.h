@@ -116,7 +116,7 @@ inline std::uint32_t ownerOf(ContainerClass containerClass) {
     return isBundleClass(containerClass) ? 33 : isSystemClass(containerClass) ? 499 : mobile;
 }
 
-/// Of one of the system's errors the code is negative.
+/// An error of the system's has a negative code.
 inline ErrorCode codeOf(const ZORError& error) {
     return error.domain() == ErrorDomain::zor ? error.replyCode() : static_cast<ErrorCode>(-error.code());
 }
@@ -202,13 +202,13 @@ public:
         return create(identifier, containerClass, transient, userId).value();
     }
 
-    /// What a registration is answered with; without entitlements it ends one.
+    /// The code that answers a registration; without entitlements it ends one.
     ErrorCode entitle(const std::string& identifier, const std::optional<plist::Dictionary>& entitlements,
                       const plist::Dictionary& options = {}) {
         return composition_->store().entitlementChange.processEntitlements(entitlements ? &*entitlements : nullptr,
                                                                            &identifier, &options);
     }
-    /// What the deletion of one container is answered with.
+    /// The code that answers the deletion of one container.
     ErrorCode stage(const FoundContainer& container) {
         const ZORMetadata& record = *container.record;
         return codeOf(daemonsClient().stageForDeleteContainersWithUsers(

@@ -2,8 +2,8 @@
 // Making a root that a daemon can serve: its directories, its users, and the entries of this installation's programs in
 // the identity registry. Needs no daemon.
 //
-// What is there stays as it is, so a run that was stopped anywhere is finished by the next one: each file appears
-// whole, each directory is given to its owner as long as it is empty. No link is followed below the root.
+// Files that are there stay as they are, so a run that was stopped anywhere is finished by the next one: each file
+// appears whole, each directory is given to its owner as long as it is empty. No link is followed below the root.
 #include "Commands.h"
 #include "fs/AtomicFile.h"
 #include "identity/LinuxPasswordDatabase.h"

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the daemon's status says of single containers: changes of data protection that are under way or wait for an
+// The daemon's status of single containers: changes of data protection that are under way or wait for an
 // unlock, and info values that could not be written.
 #pragma once
 

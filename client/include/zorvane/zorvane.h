@@ -73,11 +73,11 @@ typedef struct zorvane_error {
     uint64_t code;
     // One sentence for people, without a full stop; cut where it is longer.
     char message[1024];
-    // What to do, in the same form; may be empty.
+    // Advice what to do, in the same form; may be empty.
     char advice[1024];
 } zorvane_error;
 
-// What a code of the daemon means, how it comes about, what follows, and what to do. Never NULL; static.
+// The meaning of a code of the daemon, how it comes about, what follows, and what to do. Never NULL; static.
 const char* zorvane_code_meaning(uint64_t code);
 const char* zorvane_code_cause(uint64_t code);
 const char* zorvane_code_consequence(uint64_t code);
@@ -152,7 +152,7 @@ zorvane_value* zorvane_value_date(double seconds) ZORVANE_MUST_USE;
 zorvane_value* zorvane_value_list(void) ZORVANE_MUST_USE;
 zorvane_value* zorvane_value_map(void) ZORVANE_MUST_USE;
 zorvane_value* zorvane_value_copy(const zorvane_value* value) ZORVANE_MUST_USE;
-// Of a value that a result, a list or a map owns: never.
+// Never to be called for a value that a result, a list or a map owns.
 void zorvane_value_free(zorvane_value* value);
 // Put an element at the end of a list, or under a key of a map, in the place of the one that is there. The element
 // belongs to the library from the call on, whether it succeeds or not; it must not be used any more. Pointers to other
@@ -163,12 +163,12 @@ int zorvane_value_set(zorvane_value* map, const char* key, zorvane_value* elemen
 
 // 0 for NULL.
 int zorvane_value_type(const zorvane_value* value);
-// Of another type, or NULL: 0, 0.0 and NULL.
+// A value of another type, or NULL, gives 0, 0.0 and NULL.
 int zorvane_value_get_boolean(const zorvane_value* value);
 int64_t zorvane_value_get_integer(const zorvane_value* value);
 // Also of a ZORVANE_INTEGER that is not negative.
 uint64_t zorvane_value_get_unsigned(const zorvane_value* value);
-// Of a real or a date.
+// The number of a real or a date.
 double zorvane_value_get_real(const zorvane_value* value);
 const char* zorvane_value_get_string(const zorvane_value* value);
 // Not NULL for data of no bytes. size may be NULL.
@@ -197,7 +197,7 @@ enum {
     ZORVANE_PLACEHOLDER = 4,
     // The container is not one of the system's own programs.
     ZORVANE_THIRD_PARTY = 8,
-    // Where the device is locked, wait for its unlock.
+    // Wait for the unlock of a device that is locked.
     ZORVANE_RETRY_IF_LOCKED = 16
 };
 
@@ -268,12 +268,12 @@ zorvane_request* zorvane_request_status(void) ZORVANE_MUST_USE;
 // For tests of clients: on an internal build, the daemon ends without an answer so often, and then answers.
 zorvane_request* zorvane_request_retry_test(uint32_t user, uint64_t crashes) ZORVANE_MUST_USE;
 
-// Of one that was handed to neither zorvane_call nor zorvane_async_start.
+// Only for a request that was handed to neither zorvane_call nor zorvane_async_start.
 void zorvane_request_free(zorvane_request* request);
 
 // ---- Calls that wait ----
 
-// What the environment's ZORVANE_TIMEOUT_MILLISECONDS says, else a minute; for calls that walk a tree of files or wait
+// The environment's ZORVANE_TIMEOUT_MILLISECONDS, else a minute; for calls that walk a tree of files or wait
 // for an unlock, for ever.
 #define ZORVANE_TIMEOUT_DEFAULT INT64_C(-1)
 #define ZORVANE_TIMEOUT_NEVER INT64_C(0)
@@ -292,7 +292,7 @@ int zorvane_call(zorvane_client* client, zorvane_request* request, zorvane_resul
 // ---- Results ----
 
 void zorvane_result_free(zorvane_result* result);
-// What a command's answer does not have, and all of NULL, is NULL or 0.
+// An item that the command's answer does not have is NULL or 0, and so is each of NULL.
 const char* zorvane_result_path(const zorvane_result* result);
 const char* zorvane_result_identifier(const zorvane_result* result);
 // 16 bytes.

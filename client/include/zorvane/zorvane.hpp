@@ -163,7 +163,7 @@ private:
     std::unique_ptr<zorvane_value, Free> value_;
 };
 
-/// What a call was answered; see zorvane.h for what a command's answer has.
+/// The answer to a call; see zorvane.h for what a command's answer has.
 class Result {
 public:
     explicit Result(zorvane_result* result = nullptr) : result_(result) {}
@@ -418,7 +418,7 @@ private:
 /// dispatch throws when it has called the others.
 class Async {
 public:
-    /// Of a failed call the result is empty and the error is there.
+    /// A failed call leaves the result empty, and the error is there.
     using Callback = std::function<void(Result result, const std::optional<Error>& error)>;
 
     explicit Async(const std::string& root = "/", Timeout timeout = std::nullopt) {
