@@ -433,8 +433,11 @@ Result<void> Replace::moveNew(Progress& progress) {
 
 void Replace::recoverFromException(const Progress& progress) {
     ZORFileManager& fileManager = needs_.fileManager;
-    if (progress.swapped)
-        needs_.cache.dropAll(); // it may know some of what has happened, and the disk knows all
+    if (progress.swapped) {
+        // Nothing waits in staging. The cache may know some of what has happened, and the disk knows all.
+        needs_.cache.dropAll();
+        return;
+    }
     if (progress.oldUrl.empty() || progress.destUrl.empty() || !fileManager.itemDoesNotExistAtURL(progress.oldUrl) ||
         !fileManager.itemDoesNotExistAtURL(progress.destUrl))
         return;

@@ -186,6 +186,8 @@ private:
     /// Error 43 also when they were of a home that has changed since.
     Result<std::vector<Record>> thoseOnDisk(Here here, const Key& key, std::vector<Found> found,
                                             std::uint64_t homeGeneration);
+    /// Behind a class's name in messages.
+    static const char* suffix(bool transient) { return transient ? "(transient)" : ""; }
     static Entry entryOf(Record record);
     static void store(ClassCache& cache, Entry entry);
     static void remove(ClassCache& cache, std::string_view identifier);

@@ -1,0 +1,217 @@
+// SPDX-License-Identifier: Apache-2.0
+// The class directories as the cache reads them: for all that need one by one thread, without the mutex.
+#include "base/BlockingScope.h"
+#include "store/ClassDirectoryReader.h"
+#include "store/ZORContainerCache.h"
+
+#include <cerrno>
+#include <exception>
+#include <set>
+
+namespace zor {
+
+using platform::MutexLock;
+
+namespace {
+
+/// A look over a class directory after something has gone from it takes at most a hundredth of the time, and comes at
+/// most once a second: who owns the directory can make it necessary again and again.
+constexpr std::chrono::seconds lookOverPauseMin{1};
+constexpr int lookOverShare = 100;
+
+/// A class directory is read so often in a row while operations change the class meanwhile.
+constexpr int readsMax = 16;
+
+} // namespace
+
+ZORContainerCache::ClassCache* ZORContainerCache::knownCache(const Key& key) {
+    const UserHome* const home = homeOf(key);
+    const auto known = caches_.find(key);
+    const bool counts = known != caches_.end() && (!home || known->second.homeGeneration == home->generation());
+    return counts ? &known->second : nullptr;
+}
+
+template <typename Read>
+auto ZORContainerCache::readUnlocked(const Key& key, Read&& read) {
+    const platform::BlockingScope blocking;
+    std::optional<decltype(read())> result;
+    std::exception_ptr thrown;
+    beingRead_.insert(key);
+    cacheLock_.unlock();
+    try {
+        result.emplace(read());
+    } catch (...) {
+        thrown = std::current_exception();
+    }
+    cacheLock_.lock();
+    beingRead_.erase(key);
+    readEnded_.broadcast();
+    if (thrown)
+        std::rethrow_exception(thrown);
+    return std::move(*result);
+}
+
+Result<ZORContainerCache::ClassCache*> ZORContainerCache::_getCacheForUserId(const Key& key, Wanted wanted) {
+    if (!configuration_.users().mayOwn(key.containerClass, key.userId))
+        return makeError(log_, ZOR_HERE, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
+                         "Invalid cache get-userId %u for class %ld", key.userId,
+                         static_cast<long>(key.containerClass));
+    for (int reads = 0; reads < readsMax;) {
+        ClassCache* const before = knownCache(key);
+        if (before && (wanted == Wanted::asKnown || !before->hidesSome))
+            return before;
+        if (beingRead_.contains(key)) {
+            const platform::BlockingScope blocking;
+            readEnded_.wait(cacheLock_);
+            continue;
+        }
+        ++reads;
+        if (!before)
+            ZOR_LOG(log_, logLevelDebug, "Rebuilding container class cache: %u-%s%s", key.userId,
+                    className(key.containerClass), suffix(key.transient));
+        const std::uint64_t serial = before ? before->serial : 0;
+        const std::uint64_t drops = drops_;
+        ClassCache built = TRY(readUnlocked(key, [&] { return readClassDirectory(key); }));
+        // An operation's later change of the class is not in what was read, or not as it is.
+        const ClassCache* const now = knownCache(key);
+        if (drops != drops_ || (now ? now->serial : 0) != serial)
+            continue;
+        if (now)
+            for (const Entry& known : now->entries)
+                if (const auto again = built.entries.find(known);
+                    again != built.entries.end() && again->record->place().name() == known.record->place().name())
+                    store(built, known);
+        ClassCache& cache = caches_[key] = std::move(built);
+        noteChange(cache);
+        if (wanted == Wanted::whole && cache.hidesSome)
+            return posixError(ZOR_HERE, ENOKEY, "An encryption whose key is away hides containers of user %u, class %s",
+                              key.userId, className(key.containerClass));
+        return &cache;
+    }
+    return posixError(ZOR_HERE, EAGAIN, "The containers of user %u, class %s, changed whenever they were read",
+                      key.userId, className(key.containerClass));
+}
+
+void ZORContainerCache::prepare(std::uint32_t userId, ContainerClass containerClass, bool transient) {
+    if (!isValidClass(containerClass) || !configuration_.users().mayOwn(containerClass, userId))
+        return;
+    (void)boundary_.run(ZOR_HERE, [&]() -> Result<void> {
+        const Key key{userId, containerClass, transient};
+        UserHome* const home = homeOf(key);
+        if (home && !configuration_.homeAnswers(userId, fs::MountFence::Asked::now)) {
+            (void)home->look(); // who asks under the lock finds all questions asked
+            return {};
+        }
+        const MutexLock held(cacheLock_);
+        (void)_getCacheForUserId(key);
+        return {};
+    });
+}
+
+void ZORContainerCache::prepare(std::uint32_t userId, ContainerClass containerClass) {
+    prepare(userId, containerClass, false);
+    if (isValidClass(containerClass) && lookForDirectory({userId, containerClass, true}) == 0)
+        prepare(userId, containerClass, true);
+}
+
+int ZORContainerCache::lookForDirectory(const Key& key) {
+    const auto place = configuration_.placeOfClass(key.userId, key.containerClass, key.transient);
+    const auto directory = place ? fileManager_.resolver().openDirectory(*place) : std::unexpected(ENOENT);
+    return directory ? 0 : directory.error();
+}
+
+Result<ZORContainerCache::ClassCache> ZORContainerCache::readClassDirectory(const Key& key) {
+    UserHome* const home = homeOf(key);
+    const auto seen = home ? home->look() : UserHome::Seen();
+    if (home && seen.state == UserHome::State::missing)
+        return posixError(ZOR_HERE, ENOENT, "The home of user %u is not there; the next request looks for it again",
+                          key.userId);
+    const auto directory = configuration_.containerDirectoryURLForUser(key.userId, key.containerClass, key.transient);
+    if (!directory)
+        return posixError(ZOR_HERE, ENOENT, "User %u has no directory for class %s", key.userId,
+                          className(key.containerClass));
+    ClassDirectoryReader reader(log_, fileManager_, *directory, key.userId);
+    ClassCache cache{.entries = {}, .homeGeneration = seen.generation};
+    TRY(reader.forEach([&](Record record) {
+        record->setTransient(key.transient);
+        store(cache, entryOf(std::move(record)));
+    }));
+    cache.hidesSome = reader.metHidden();
+    // A daemon that was killed may have left containers here that are not on the disk yet; who finds one here is told
+    // that it exists.
+    const auto opened = fileManager_.resolver().openDirectory(*directory);
+    const int synced = opened ? durability_.afterMove(opened->get()) : -opened.error();
+    if (synced < 0)
+        return posixError(ZOR_HERE, -synced, "sync of %s failed: %s", directory->c_str(), errorText(-synced));
+    return cache;
+}
+
+bool ZORContainerCache::lookOver(const Key& key, const Found& gone) {
+    const auto directory = configuration_.containerDirectoryURLForUser(key.userId, key.containerClass, key.transient);
+    const MutexLock held(cacheLock_);
+    const auto stillLies = [&](const ClassCache& cache) {
+        const auto known = cache.entries.find(std::string_view(gone.record->identifier()));
+        return known != cache.entries.end() && known->record->place().name() == gone.place.name();
+    };
+    const auto before = caches_.find(key);
+    if (before == caches_.end() || beingRead_.contains(key) || !stillLies(before->second))
+        return true; // somebody has been here meanwhile, or is
+    using Clock = std::chrono::steady_clock;
+    const auto begin = Clock::now();
+    if (begin < nextLookOver_[key] || !directory)
+        return false;
+    const std::uint64_t serial = before->second.serial;
+    std::set<std::string> names;
+    ClassCache there;
+    const auto read = readUnlocked(key, [&] {
+        return ClassDirectoryReader(log_, fileManager_, *directory, key.userId).forEach([&](Record record) {
+            names.insert(record->place().name());
+            record->setTransient(key.transient);
+            store(there, entryOf(std::move(record)));
+        });
+    });
+    const auto end = Clock::now();
+    nextLookOver_[key] = end + std::max<Clock::duration>(lookOverPauseMin, (end - begin) * lookOverShare);
+    if (!read)
+        return false;
+    const auto now = caches_.find(key);
+    if (now == caches_.end())
+        return true;
+    // Only of what has gone from its place: others may be in the hands of an operation. When there has been one, the
+    // place of the one that was looked for is all that is known to be the same.
+    const bool unchanged = now->second.serial == serial;
+    for (const Entry& entry : there.entries) {
+        const auto cached = now->second.entries.find(std::string_view(entry.record->identifier()));
+        if (cached == now->second.entries.end() || names.contains(cached->record->place().name()))
+            continue;
+        if (!unchanged && (cached->record->identifier() != gone.record->identifier() || !stillLies(now->second)))
+            continue;
+        log_.write(logLevelNotice, __func__, "Cache: %s%s: Identifier: %s was moved from %s to %s",
+                   className(key.containerClass), suffix(key.transient), ZOR_SHOWN(entry.record->identifier()),
+                   cached->record->url().c_str(), entry.record->url().c_str());
+        store(now->second, entry);
+    }
+    noteChange(now->second);
+    return true;
+}
+
+bool ZORContainerCache::buildAllOfUser(std::uint32_t userId) {
+    bool shortage = false;
+    for (std::uint64_t number = 1; ipc::isContainerClass(number); ++number)
+        for (const bool transient : {false, true}) {
+            const Key key{userId, static_cast<ContainerClass>(number), transient};
+            if (!configuration_.users().mayOwn(key.containerClass, userId))
+                continue;
+            // A class that cannot be read holds nothing in memory either.
+            const int failure = lookForDirectory(key);
+            if (failure == 0) {
+                const MutexLock held(cacheLock_);
+                (void)_getCacheForUserId(key);
+            }
+            shortage = shortage || isOwnShortage(failure);
+        }
+    UserHome* const home = configuration_.homeOf(userId);
+    return !shortage && (!home || home->lookIfDue().state != UserHome::State::missing);
+}
+
+} // namespace zor
