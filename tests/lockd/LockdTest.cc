@@ -71,8 +71,8 @@ public:
         sd_bus_emit_properties_changed(bus_, path(name).c_str(), sessionInterface, "LockedHint", nullptr);
     }
     /// Answers for as long as `isOver` says no. False: it never said yes.
-    bool serve(const std::function<bool()>& isOver) const {
-        for (const auto end = std::chrono::steady_clock::now() + patience; !isOver();) {
+    bool serve(const std::function<bool()>& isOver, std::chrono::milliseconds time = patience) const {
+        for (const auto end = std::chrono::steady_clock::now() + time; !isOver();) {
             if (std::chrono::steady_clock::now() > end)
                 return false;
             if (sd_bus_process(bus_, nullptr) == 0)
@@ -180,15 +180,23 @@ TEST(Lockd, TellsWhatTheLoginServiceSays) {
          },
          "0\n"},
         {"the open one ends, and the other is still locked", [&] { login.end("d"); }, "1\n"},
-        {"the service goes, and nobody is there", [&] { login.leave(); }, "0\n"},
-        {"the service comes back", [&] { login.own(); }, "1\n"},
+        {"the service goes, which unlocks nothing, also where others say so; it comes back, and a session is open",
+         [&] {
+             login.leave();
+             hostile.signal("a", "Unlock", login.asker);
+             EXPECT_FALSE(
+                 login.serve([&] { return support::readFile(state) != "1\n"; }, std::chrono::milliseconds(300)));
+             login.sessions.at(LoginService::path("a")).hint = false;
+             login.own();
+         },
+         "0\n"},
         {"started anew after a kill",
          [&] {
              lockd->signal(SIGKILL);
-             login.sessions.at(LoginService::path("a")).hint = false;
+             login.sessions.at(LoginService::path("a")).hint = true;
              start();
          },
-         "0\n"},
+         "1\n"},
     };
     for (const auto& step : steps) {
         SCOPED_TRACE(step.what);

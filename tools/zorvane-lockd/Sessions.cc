@@ -79,7 +79,6 @@ int Sessions::follow() {
 }
 
 void Sessions::begin() {
-    locked_.clear();
     owner_.clear();
     sd_bus_message* reply = nullptr;
     const char* owner = nullptr;
@@ -89,15 +88,17 @@ void Sessions::begin() {
         owner_ = owner;
     sd_bus_message_unref(reply);
     reply = nullptr;
+    // As long as nobody says what is so, what was told last holds: a service that has died unlocks nothing.
     if (!owner_.empty() && sd_bus_call_method(bus_, service, managerPath, managerInterface, "ListSessions", nullptr,
                                               &reply, nullptr) >= 0) {
+        locked_.clear();
         const char* path = nullptr;
         (void)sd_bus_message_enter_container(reply, 'a', "(susso)");
         while (sd_bus_message_read(reply, "(susso)", nullptr, nullptr, nullptr, nullptr, &path) > 0)
             add(path);
+        tell();
     }
     sd_bus_message_unref(reply);
-    tell();
 }
 
 void Sessions::add(const std::string& path) {
@@ -118,25 +119,28 @@ bool Sessions::isServices(sd_bus_message* message) const {
 
 int Sessions::added(sd_bus_message* message) {
     const char* path = nullptr;
-    if (isServices(message) && sd_bus_message_read(message, "so", nullptr, &path) > 0)
+    if (isServices(message) && sd_bus_message_read(message, "so", nullptr, &path) > 0) {
         add(path);
-    tell();
+        tell();
+    }
     return 0;
 }
 
 int Sessions::removed(sd_bus_message* message) {
     const char* path = nullptr;
-    if (isServices(message) && sd_bus_message_read(message, "so", nullptr, &path) > 0)
+    if (isServices(message) && sd_bus_message_read(message, "so", nullptr, &path) > 0) {
         locked_.erase(path);
-    tell();
+        tell();
+    }
     return 0;
 }
 
 int Sessions::lockSaid(sd_bus_message* message) {
     const auto session = locked_.find(sd_bus_message_get_path(message));
-    if (isServices(message) && session != locked_.end())
+    if (isServices(message) && session != locked_.end()) {
         session->second = std::string_view(sd_bus_message_get_member(message)) == "Lock";
-    tell();
+        tell();
+    }
     return 0;
 }
 

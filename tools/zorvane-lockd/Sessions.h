@@ -16,7 +16,7 @@ namespace zorvanelockd {
 
 class Sessions {
 public:
-    /// `changed` is told the state after each event that may have changed it, and at the beginning.
+    /// `changed` is told the state after each event that may have changed it, and when the service has been asked.
     using Changed = std::function<void(bool isLocked)>;
     Sessions(sd_bus* bus, Changed changed) : bus_(bus), changed_(std::move(changed)) {}
     Sessions(const Sessions&) = delete;
@@ -33,7 +33,7 @@ private:
     int propertiesChanged(sd_bus_message* message);
     int ownerChanged(sd_bus_message* message);
 
-    /// Asks the service for all that there is.
+    /// Asks the service for all that there is. One that does not answer leaves everything as it was.
     void begin();
     void add(const std::string& path);
     void tell();
