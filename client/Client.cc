@@ -5,7 +5,7 @@
 #include "Connection.h"
 #include "ipc/ContainerClasses.h"
 #include "ipc/Keys.h"
-#include "ipc/Uuid.h"
+#include "ipc/UUID.h"
 
 #include <charconv>
 #include <iterator>
@@ -112,7 +112,7 @@ plist::Dictionary addressed(ipc::Command command, const Client::Address& address
     message.set(keys::containerClass, address.containerClass);
     message.set(keys::userId, address.user);
     message.set(keys::identifier, address.identifier);
-    message.set(keys::uuid, ipc::uuidValue(address.uuid));
+    message.set(keys::uuid, zor::UUID(address.uuid).value());
     return message;
 }
 
@@ -139,10 +139,10 @@ bool appendListed(const plist::Dictionary& reply, std::vector<ListedContainer>& 
         return false;
     for (std::size_t i = 0; i < identifiers->size(); ++i) {
         const std::string* identifier = (*identifiers)[i].asString();
-        const auto uuid = ipc::uuidOf(&(*uuids)[i]);
+        const auto uuid = zor::UUID::of(&(*uuids)[i]);
         if (!identifier || !uuid)
             return false;
-        containers.push_back({.uuid = *uuid, .identifier = *identifier});
+        containers.push_back({.uuid = uuid->bytes(), .identifier = *identifier});
     }
     return true;
 }
@@ -190,7 +190,7 @@ std::string_view containerClassName(std::uint64_t number) {
 }
 
 std::string uuidText(const std::array<std::uint8_t, 16>& uuid) {
-    return ipc::uuidText(uuid);
+    return zor::UUID(uuid).string();
 }
 
 std::string_view protectionClassInfoKey() {
@@ -219,13 +219,13 @@ Result<Container> Client::createOrLookup(const Lookup& lookup) {
     const auto reply = connection_->call(message);
     if (!reply)
         return std::unexpected(reply.error());
-    const auto uuid = ipc::uuidOf(*reply, keys::replyUUID);
+    const auto uuid = zor::UUID::of(*reply, keys::replyUUID);
     const std::string* identifier = reply->string(keys::replyIdentifier);
     const std::string* path = reply->string(keys::replyPath);
     if (!uuid || !identifier || !path)
         return incomplete();
     return Container{
-        .uuid = *uuid, .identifier = *identifier, .path = *path, .existed = reply->isTrue(keys::replyExisted)};
+        .uuid = uuid->bytes(), .identifier = *identifier, .path = *path, .existed = reply->isTrue(keys::replyExisted)};
 }
 
 Result<Client::Page> Client::listPage(std::uint64_t containerClass, std::uint32_t user, bool transient,
@@ -283,7 +283,7 @@ Result<void> Client::stageForDelete(const std::vector<Address>& containers) {
         classes.emplace_back(container.containerClass);
         users.emplace_back(container.user);
         identifiers.emplace_back(container.identifier);
-        uuids.push_back(ipc::uuidValue(container.uuid));
+        uuids.push_back(zor::UUID(container.uuid).value());
     }
     plist::Dictionary message = request(ipc::Command::stageContainersForDelete);
     message.set(keys::containerClassesArray, std::move(classes));
@@ -309,12 +309,12 @@ Result<void> Client::replace(const std::optional<Address>& old, const Address& f
         message.set(keys::oldContainerClass, old->containerClass);
         message.set(keys::oldContainerUserId, old->user);
         message.set(keys::oldIdentifier, old->identifier);
-        message.set(keys::oldContainerUUID, ipc::uuidValue(old->uuid));
+        message.set(keys::oldContainerUUID, zor::UUID(old->uuid).value());
     }
     message.set(keys::newContainerClass, fresh.containerClass);
     message.set(keys::newContainerUserId, fresh.user);
     message.set(keys::newIdentifier, fresh.identifier);
-    message.set(keys::newContainerUUID, ipc::uuidValue(fresh.uuid));
+    message.set(keys::newContainerUUID, zor::UUID(fresh.uuid).value());
     return withoutContent(connection_->call(message));
 }
 

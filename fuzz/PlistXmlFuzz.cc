@@ -2,7 +2,7 @@
 // Any bytes as an XML property list. A value that reads has to be writable in the binary form and to read back from it
 // equal.
 #include "plist/Binary.h"
-#include "plist/Xml.h"
+#include "plist/Read.h"
 
 #include <cstdlib>
 

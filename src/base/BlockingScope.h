@@ -17,8 +17,11 @@ public:
     virtual void didBlock() noexcept = 0;
 
     /// Makes `observer` (or nobody, with nullptr) the one that the scopes of this thread tell.
-    static void setForThisThread(BlockingObserver* observer);
-    [[nodiscard]] static BlockingObserver* ofThisThread();
+    static void setForThisThread(BlockingObserver* observer) { threadObserver_ = observer; }
+    [[nodiscard]] static BlockingObserver* ofThisThread() { return threadObserver_; }
+
+private:
+    static inline thread_local BlockingObserver* threadObserver_ = nullptr;
 };
 
 class BlockingScope {

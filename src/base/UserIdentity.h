@@ -5,7 +5,7 @@
 
 #include "base/ContainerClass.h"
 #include "base/Mutex.h"
-#include "base/Result.h"
+#include "base/ZORError.h"
 #include "ipc/UserNumbers.h"
 #include "platform/Device.h"
 

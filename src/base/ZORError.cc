@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "base/ZORError.h"
 
-#include "base/LogSubject.h"
+#include "base/Log.h"
 
 #include <bit>
 #include <cerrno>

@@ -1,14 +1,18 @@
 // SPDX-License-Identifier: Apache-2.0
-// Error values: a domain, a code, what happened in words, what caused it, and where it was made.
+// Errors of the daemon's own domain, and Result: the value of an operation, or its ZORError. An operation logs an
+// error or hands it on, as its description says. A code, once given out, keeps its meaning: clients get it as
+// "ReplyError".
 #pragma once
 
 #include "base/ErrorCode.h"
 #include "base/Log.h"
-#include "base/Shortage.h"
 
+#include <cstdint>
+#include <expected>
 #include <memory>
 #include <optional>
 #include <string>
+#include <utility>
 
 namespace zor {
 
@@ -75,4 +79,35 @@ void logError(const Log& log, const ZORError& error);
 /// The text of an errno value, safe in any thread.
 const char* errorText(int number);
 
+template <typename T>
+class [[nodiscard]] Result : public std::expected<T, ZORError> {
+public:
+    using std::expected<T, ZORError>::expected;
+    Result(ZORError error) : std::expected<T, ZORError>(std::unexpect, std::move(error)) {}
+};
+
+template <>
+class [[nodiscard]] Result<void> : public std::expected<void, ZORError> {
+public:
+    using std::expected<void, ZORError>::expected;
+    Result(ZORError error) : std::expected<void, ZORError>(std::unexpect, std::move(error)) {}
+};
+
+} // namespace zor
+
+/// The value of a Result; an error leaves the function with it.
+#define TRY(expression)                                                                                                \
+    __extension__({                                                                                                    \
+        auto zorResult_ = (expression);                                                                                \
+        if (!zorResult_)                                                                                               \
+            return std::move(zorResult_).error();                                                                      \
+        ::zor::takeValue(zorResult_);                                                                                  \
+    })
+
+namespace zor {
+template <typename T>
+T takeValue(Result<T>& result) {
+    return std::move(*result);
+}
+inline void takeValue(Result<void>&) {}
 } // namespace zor

@@ -6,7 +6,7 @@
 // Only std::exception and what derives from it counts; anything else passes through and is nobody's to swallow.
 #pragma once
 
-#include "base/Result.h"
+#include "base/ZORError.h"
 #include "platform/Device.h"
 
 #include <exception>

@@ -2,7 +2,7 @@
 #include "check/CheckedSystem.h"
 
 #include "identity/UserConfiguration.h"
-#include "os/DaemonLock.h"
+#include "os/SystemRoot.h"
 
 #include <cerrno>
 #include <fcntl.h>

@@ -2,7 +2,7 @@
 #include "check/ContainerCheck.h"
 
 #include "base/UserIdentity.h"
-#include "check/ShellText.h"
+#include "check/Repair.h"
 #include "fs/AtomicFile.h"
 #include "fs/ItemStatus.h"
 #include "fs/Names.h"

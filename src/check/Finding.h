@@ -3,7 +3,7 @@
 #pragma once
 
 #include "base/ContainerClass.h"
-#include "base/UUID.h"
+#include "ipc/UUID.h"
 
 #include <cstddef>
 #include <cstdint>

@@ -3,7 +3,7 @@
 
 #include "base/UserIdentity.h"
 #include "fs/BulkDirectoryRead.h"
-#include "fs/Hidden.h"
+#include "fs/PathResolver.h"
 #include "os/Names.h"
 #include "store/Names.h"
 #include "store/UserHome.h"

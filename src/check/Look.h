@@ -5,7 +5,7 @@
 
 #include "check/CheckedSystem.h"
 #include "check/Finding.h"
-#include "check/ShellText.h"
+#include "check/Repair.h"
 #include "check/StoreCheck.h"
 #include "os/FileDescriptor.h"
 #include "store/ZORWhitelist.h"

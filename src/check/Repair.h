@@ -1,16 +1,24 @@
 // SPDX-License-Identifier: Apache-2.0
-// The steps that put findings right, as a list: it is shown, or gone through, and is the same in both cases.
-//
-// Only what a running daemon does when it is asked is ever done. The work of its next start is left to that, and what
-// needs a person to a person: in doubt nothing is deleted.
+// Command lines for people to type.
 #pragma once
 
 #include "check/Finding.h"
 
 #include <string>
+#include <string_view>
 #include <vector>
 
 namespace zor::check {
+
+/// One word of a shell's, whatever bytes it holds; nothing in it steers a terminal.
+[[nodiscard]] std::string shellQuoted(std::string_view text);
+
+/// A program of the system's that takes "--root", for this root.
+[[nodiscard]] std::string programFor(std::string_view program, std::string_view root);
+
+/// `command`, in this directory and nowhere else: the directory lies where a client may put a link in its place
+/// meanwhile, and root types this.
+[[nodiscard]] std::string inDirectory(std::string_view directory, std::string_view command);
 
 struct RepairStep {
     enum class Act : std::uint8_t {

@@ -6,7 +6,7 @@
 #include "daemon/Operations.h"
 #include "daemon/ZORClientConnection.h"
 #include "ipc/Keys.h"
-#include "platform/ServiceListener.h"
+#include "platform/Service.h"
 
 #include <array>
 #include <memory>

@@ -16,6 +16,7 @@
 #include "daemon/ZORClientConnection.h"
 #include "fs/Durability.h"
 #include "fs/ZORFileManager.h"
+#include "os/RunLoop.h"
 #include "platform/Platform.h"
 #include "store/ZORContainerCache.h"
 #include "store/ZORGlobalConfiguration.h"

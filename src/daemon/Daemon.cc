@@ -1,13 +1,13 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/Daemon.h"
 
+#include "ipc/Names.h"
 #include "os/Names.h"
+#include "service/ServiceListener.h"
 
 namespace zor {
 
 namespace {
-
-constexpr std::string_view serviceName = "com.veltra.zorvaned";
 
 struct LogSize {
     unsigned fileCount;
@@ -52,7 +52,7 @@ int Daemon::run() {
 void Daemon::openLog() {
     const platform::Platform& platform = composition_.platform();
     const FileURL file = composition_.configuration().logDirectory().appendingFile(platform::names::logFile);
-    if (!platform.log.open(serviceName, options_.logLevel))
+    if (!platform.log.open(ipc::serviceName, options_.logLevel))
         platform.log.writeToSystemLog(logLevelError,
                                       formatted("Failed to set up rotating logs at path %s", file.c_str()));
     const LogSize size = platform.internalBuild.isInternalBuild() ? internalLogSize : logSize;
@@ -145,6 +145,24 @@ bool Daemon::startListener() {
     if (!listening)
         composition_.log().write(logLevelError, "main", "unable to start ipsi service!");
     return listening;
+}
+
+namespace {
+/// Questions in the time that the manager waits: a pool that is late once is asked again before it is too late.
+constexpr int questions = 4;
+} // namespace
+
+void Watchdog::start(std::optional<std::chrono::microseconds> patience) {
+    if (!patience)
+        return;
+    every_ = std::chrono::ceil<std::chrono::milliseconds>(*patience / questions);
+    feed();
+}
+
+void Watchdog::feed() {
+    if (poolAnswers_())
+        (void)notify_.send("WATCHDOG=1\nSTATUS=" + describe_());
+    timer_.set(every_);
 }
 
 } // namespace zor

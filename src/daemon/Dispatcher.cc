@@ -2,7 +2,7 @@
 #include "daemon/Dispatcher.h"
 
 #include "base/EntitlementKeys.h"
-#include "base/LogSubject.h"
+#include "base/Log.h"
 #include "ipc/Identifier.h"
 
 #include <algorithm>

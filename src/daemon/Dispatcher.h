@@ -8,7 +8,7 @@
 #include "base/UserIdentity.h"
 #include "daemon/CommandTable.h"
 #include "daemon/Operations.h"
-#include "platform/ServiceListener.h"
+#include "platform/Service.h"
 
 #include <atomic>
 #include <cstdint>

@@ -16,16 +16,15 @@
 #include "identity/LinuxPasswordDatabase.h"
 #include "identity/LinuxPeerIdentity.h"
 #include "ipc/UserNumbers.h"
-#include "os/DaemonLock.h"
-#include "os/EpollRunLoop.h"
 #include "os/LinuxDisk.h"
 #include "os/RotatingLog.h"
+#include "os/RunLoop.h"
 #include "os/SerialWorkQueue.h"
+#include "os/ServiceManager.h"
 #include "os/SystemRoot.h"
 #include "platform/Platform.h"
-#include "service/LinuxServiceListener.h"
-#include "service/PassedSockets.h"
 #include "service/SeqpacketUpcallPort.h"
+#include "service/ServiceListener.h"
 
 #include <expected>
 #include <memory>
@@ -55,8 +54,8 @@ public:
 
     [[nodiscard]] const SystemRoot& root() const { return root_; }
     [[nodiscard]] const ipc::ConfiguredUsers& users() const { return users_; }
-    [[nodiscard]] EpollRunLoop& runLoop() { return runLoop_; }
-    [[nodiscard]] LinuxServiceListener& listener() { return listener_; }
+    [[nodiscard]] RunLoop& runLoop() { return runLoop_; }
+    [[nodiscard]] ServiceListener& listener() { return listener_; }
     [[nodiscard]] LinuxPeerIdentity& peers() { return peers_; }
     [[nodiscard]] SemaphoreBootMarker& bootMarker() { return bootMarker_; }
     [[nodiscard]] RotatingLog& log() { return log_; }
@@ -76,7 +75,7 @@ private:
     PassedSockets passed_;
     LinuxDisk disk_;
     RotatingLog log_;
-    EpollRunLoop runLoop_;
+    RunLoop runLoop_;
     LinuxInternalBuildQuery internalBuild_{root_};
     LinuxSystemVersionQuery systemVersion_{root_};
     LinuxPasswordDatabase passwords_{root_};
@@ -90,7 +89,7 @@ private:
     IdentityRegistry registry_;
     LinuxPeerIdentity peers_;
     SeqpacketUpcallPort upcallPort_;
-    LinuxServiceListener listener_;
+    ServiceListener listener_;
     SerialWorkQueue deathRowQueue_;
     SerialWorkQueue lockStateQueue_;
 };

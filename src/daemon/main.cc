@@ -5,11 +5,10 @@
 #include "daemon/LinuxPlatform.h"
 #include "daemon/Options.h"
 #include "daemon/Status.h"
-#include "daemon/Watchdog.h"
-#include "os/EpollRunLoop.h"
 #include "os/FileDescriptor.h"
 #include "os/Names.h"
-#include "os/NotifySocket.h"
+#include "os/RunLoop.h"
+#include "os/ServiceManager.h"
 #include "service/StatusSocket.h"
 #include "store/RootNeeds.h"
 
@@ -102,7 +101,7 @@ private:
     }
 
     platform::SignalDescriptor signals_{SIGTERM, SIGINT};
-    platform::EpollRunLoop& loop_;
+    platform::RunLoop& loop_;
     platform::ServiceTransactions& transactions_;
     std::atomic<bool> wanted_{false};
 };

@@ -1,10 +1,11 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "device/FileDeviceLockState.h"
 
-#include "base/Shortage.h"
+#include "base/ErrorCode.h"
 #include "os/Inotify.h"
 #include "os/Names.h"
 #include "os/Openat2.h"
+#include "os/RunLoop.h"
 
 #include <cerrno>
 #include <charconv>

@@ -11,6 +11,7 @@
 
 #include "base/Mutex.h"
 #include "os/FileDescriptor.h"
+#include "os/RunLoop.h"
 #include "os/SystemRoot.h"
 #include "platform/Device.h"
 

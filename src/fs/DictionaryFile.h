@@ -3,7 +3,7 @@
 #pragma once
 
 #include "base/FileURL.h"
-#include "base/Result.h"
+#include "base/ZORError.h"
 #include "fs/ZORFileManager.h"
 #include "plist/Value.h"
 

@@ -16,6 +16,7 @@
 
 #include <cstdint>
 #include <functional>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <sys/stat.h>
@@ -94,5 +95,13 @@ private:
 /// before the process's mask.
 [[nodiscard]] OpenResult makeDirectories(platform::Disk& disk, int base, std::string_view relativePath, mode_t mode,
                                          Mounts mounts);
+
+// Telling what is missing from what is hidden: a directory that is encrypted, while its key is away, answers for each
+// name that there is none. Asked only where a name was not found, so what is found costs nothing.
+
+/// The directory at `url`, or the nearest one above it that is there, when that hides what is in it.
+[[nodiscard]] std::optional<FileURL> hiddenBy(const PathResolver& resolver, platform::Disk& disk, const FileURL& url);
+/// Whether the directory `name` in an open one hides what is in it.
+[[nodiscard]] bool hidesNamesBelow(platform::Disk& disk, int directory, const char* name);
 
 } // namespace zor::fs

@@ -3,8 +3,8 @@
 #include "fs/ZORFileManager.h"
 
 #include "fs/AtomicFile.h"
-#include "fs/Hidden.h"
 #include "fs/ItemStatus.h"
+#include "fs/PathResolver.h"
 #include "os/Openat2.h"
 
 #include <cerrno>

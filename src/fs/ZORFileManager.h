@@ -13,7 +13,7 @@
 
 #include "base/FileURL.h"
 #include "base/Mutex.h"
-#include "base/Result.h"
+#include "base/ZORError.h"
 #include "fs/DiskUsage.h"
 #include "fs/PathResolver.h"
 #include "fs/TreeWalker.h"

@@ -4,6 +4,7 @@
 #include "base/Format.h"
 #include "os/CoarseClock.h"
 #include "os/Names.h"
+#include "os/RunLoop.h"
 #include "plist/Value.h"
 
 #include <algorithm>

@@ -21,7 +21,7 @@
 #include "identity/RegistryDirectory.h"
 #include "identity/RegistryWatches.h"
 #include "platform/PlatformLog.h"
-#include "platform/RunLoop.h"
+#include "platform/WorkQueue.h"
 
 #include <atomic>
 #include <cstdint>
@@ -31,6 +31,8 @@
 #include <vector>
 
 namespace zor::platform {
+
+class RunLoop;
 
 class IdentityRegistry {
 public:

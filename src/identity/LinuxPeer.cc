@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "identity/LinuxPeer.h"
 
-#include "base/Shortage.h"
-#include "identity/CgroupUnit.h"
+#include "base/ErrorCode.h"
+#include "identity/LinuxPeerIdentity.h"
 #include "os/CoarseClock.h"
 #include "os/Openat2.h"
 

@@ -7,7 +7,15 @@
 #include "identity/IdentityRegistry.h"
 #include "platform/PeerIdentity.h"
 
+#include <string>
+#include <string_view>
+
 namespace zor::platform {
+
+/// The first name in the process's path that is no slice: units of the system manager lie in slices only. So a unit
+/// that a user's own manager started, whatever its name, is not it; what lies deeper than a system unit belongs to that
+/// unit. Empty when there is none.
+[[nodiscard]] std::string systemUnitInCgroups(std::string_view cgroups);
 
 class LinuxPeerIdentity final : public PeerIdentity {
 public:

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "identity/RegistryDirectory.h"
 
-#include "base/Shortage.h"
+#include "base/ErrorCode.h"
 #include "os/Names.h"
 #include "os/Openat2.h"
 

@@ -1,17 +1,31 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "identity/UserConfiguration.h"
 
+#include "identity/LinuxPasswordDatabase.h"
 #include "os/FileDescriptor.h"
 #include "os/Names.h"
 #include "os/Openat2.h"
 
 #include <cerrno>
+#include <charconv>
 #include <cstring>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 namespace zor::platform {
+
+std::expected<std::uint32_t, std::string> userNumberOf(const SystemRoot& root, const std::string& text) {
+    std::uint32_t number = 0;
+    const char* const end = text.data() + text.size();
+    const auto [last, failure] = std::from_chars(text.data(), end, number);
+    if (failure == std::errc() && last == end)
+        return number;
+    if (const auto entry = LinuxPasswordDatabase(root).entryForName(text))
+        return entry->uid;
+    return std::unexpected("'" + text + "' is neither a user id nor a user of " +
+                           (root.isDeviceRoot() ? "this system" : root.path("etc/passwd")));
+}
 
 namespace {
 

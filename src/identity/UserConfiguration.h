@@ -9,10 +9,14 @@
 #include "os/SystemRoot.h"
 #include "platform/Device.h"
 
+#include <cstdint>
 #include <expected>
 #include <string>
 
 namespace zor::platform {
+
+/// A user id as it stands, or that of a name in the root's user database; else in words what is wrong. Any thread.
+[[nodiscard]] std::expected<std::uint32_t, std::string> userNumberOf(const SystemRoot& root, const std::string& text);
 
 /// The numbers, those of ipc::UserNumbers where there is no file. Else one line that says what is wrong, in which file,
 /// and what to do.

@@ -9,14 +9,20 @@
 // The payload is a binary property list whose root is a dictionary. These functions judge the header alone.
 #pragma once
 
-#include "ipc/Limits.h"
-
 #include <array>
 #include <cstddef>
 #include <cstdint>
 #include <span>
 
 namespace zor::ipc {
+
+/// Length, flags, id.
+inline constexpr std::size_t frameHeaderBytes = 16;
+/// A request names one operation on one container; its largest part is an info value, and a metadata file takes 1 MiB
+/// too.
+inline constexpr std::uint32_t requestPayloadBytesMax = 1'048'576;
+/// A reply is as long as its length field can say: a list of all containers of a class has no other bound.
+inline constexpr std::uint32_t replyPayloadBytesMax = 0xFFFF'FFFF;
 
 inline constexpr std::uint32_t frameExpectsReply = 1U << 0;
 inline constexpr std::uint32_t frameIsReply = 1U << 1;

@@ -2,7 +2,7 @@
 // Work that nobody waits for: a queue, and the marks by which the daemon counts as busy while something is on it.
 #pragma once
 
-#include "platform/RunLoop.h"
+#include "platform/WorkQueue.h"
 
 #include <functional>
 #include <utility>

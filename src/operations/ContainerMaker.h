@@ -13,7 +13,7 @@
 #pragma once
 
 #include "base/ContainerClass.h"
-#include "base/Result.h"
+#include "base/ZORError.h"
 #include "fs/Durability.h"
 #include "fs/ZORFileManager.h"
 #include "operations/DeathRow.h"

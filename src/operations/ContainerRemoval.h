@@ -8,10 +8,10 @@
 
 #include "base/ContainerClass.h"
 #include "base/FileURL.h"
-#include "base/Result.h"
-#include "base/UUID.h"
+#include "base/ZORError.h"
 #include "base/ZORException.h"
 #include "base/ZORLocks.h"
+#include "ipc/UUID.h"
 #include "operations/DeathRow.h"
 #include "operations/LastingMoves.h"
 #include "operations/ReplaceRecovery.h"

@@ -11,10 +11,10 @@
 #pragma once
 
 #include "base/ContainerClass.h"
-#include "base/Result.h"
-#include "base/UUID.h"
+#include "base/ZORError.h"
 #include "base/ZORException.h"
 #include "base/ZORLocks.h"
+#include "ipc/UUID.h"
 #include "operations/Caller.h"
 #include "operations/ContainerMaker.h"
 #include "operations/DeathRow.h"

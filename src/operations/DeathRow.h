@@ -16,7 +16,7 @@
 
 #include "base/FileURL.h"
 #include "base/Mutex.h"
-#include "base/Result.h"
+#include "base/ZORError.h"
 #include "base/ZORException.h"
 #include "fs/Durability.h"
 #include "fs/ZORFileManager.h"

@@ -15,7 +15,7 @@
 #include "base/ErrorCode.h"
 #include "base/FileURL.h"
 #include "base/Mutex.h"
-#include "base/Result.h"
+#include "base/ZORError.h"
 #include "base/ZORException.h"
 #include "base/ZORLocks.h"
 #include "operations/ContainerRemoval.h"

@@ -5,7 +5,7 @@
 // holds the container's lock; the overloads that take one are for who holds it already. Any thread.
 #pragma once
 
-#include "base/Result.h"
+#include "base/ZORError.h"
 #include "base/ZORException.h"
 #include "base/ZORLocks.h"
 #include "fs/ZORFileManager.h"

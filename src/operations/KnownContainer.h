@@ -5,9 +5,9 @@
 #pragma once
 
 #include "base/ContainerClass.h"
-#include "base/Result.h"
-#include "base/UUID.h"
+#include "base/ZORError.h"
 #include "base/ZORLocks.h"
+#include "ipc/UUID.h"
 #include "store/ZORContainerCache.h"
 
 #include <cstdint>

@@ -6,7 +6,7 @@
 #pragma once
 
 #include "base/FileURL.h"
-#include "base/Result.h"
+#include "base/ZORError.h"
 #include "fs/Durability.h"
 #include "fs/ZORFileManager.h"
 

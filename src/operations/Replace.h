@@ -30,10 +30,10 @@
 #pragma once
 
 #include "base/ContainerClass.h"
-#include "base/Result.h"
-#include "base/UUID.h"
+#include "base/ZORError.h"
 #include "base/ZORException.h"
 #include "base/ZORLocks.h"
+#include "ipc/UUID.h"
 #include "operations/DeathRow.h"
 #include "operations/LastingMoves.h"
 #include "operations/ReplaceRecovery.h"

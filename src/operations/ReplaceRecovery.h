@@ -12,14 +12,14 @@
 
 #include "base/ContainerClass.h"
 #include "base/FileURL.h"
-#include "base/Result.h"
-#include "base/UUID.h"
+#include "base/ZORError.h"
 #include "base/ZORLocks.h"
 #include "fs/ZORFileManager.h"
+#include "ipc/UUID.h"
 #include "operations/DeathRow.h"
 #include "operations/LastingMoves.h"
+#include "store/ReplaceJournal.h"
 #include "store/SetupReport.h"
-#include "store/WaitingReplaces.h"
 #include "store/ZORContainerCache.h"
 #include "store/ZORGlobalConfiguration.h"
 

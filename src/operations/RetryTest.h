@@ -3,7 +3,7 @@
 // The count is kept in the info of a container of its own, so it survives each end.
 #pragma once
 
-#include "base/Result.h"
+#include "base/ZORError.h"
 #include "base/ZORException.h"
 #include "operations/Caller.h"
 #include "operations/Creation.h"

@@ -12,7 +12,7 @@
 #pragma once
 
 #include "base/FileURL.h"
-#include "base/Result.h"
+#include "base/ZORError.h"
 #include "base/ZORException.h"
 #include "base/ZORLocks.h"
 #include "fs/ZORFileManager.h"

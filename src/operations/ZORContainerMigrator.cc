@@ -2,7 +2,7 @@
 #include "operations/ZORContainerMigrator.h"
 
 #include "base/UserIdentity.h"
-#include "fs/Hidden.h"
+#include "fs/PathResolver.h"
 #include "store/Names.h"
 
 #include <algorithm>

@@ -11,7 +11,7 @@
 
 #include "base/ContainerClass.h"
 #include "base/FileURL.h"
-#include "base/Result.h"
+#include "base/ZORError.h"
 #include "operations/DeathRow.h"
 #include "operations/LastingMoves.h"
 #include "store/MigrationMarkers.h"

@@ -15,7 +15,7 @@
 // Held by shared_ptr: a retry that waits on the lock-state queue keeps it. It runs on one thread at a time.
 #pragma once
 
-#include "base/Result.h"
+#include "base/ZORError.h"
 #include "base/ZORException.h"
 #include "base/ZORLocks.h"
 #include "fs/TreeWalker.h"

@@ -7,7 +7,7 @@
 #pragma once
 
 #include "base/ContainerClass.h"
-#include "base/Result.h"
+#include "base/ZORError.h"
 #include "base/ZORException.h"
 #include "base/ZORLocks.h"
 #include "operations/Caller.h"

@@ -14,7 +14,7 @@
 
 #include "base/Mutex.h"
 #include "os/FileDescriptor.h"
-#include "os/Journal.h"
+#include "os/ServiceManager.h"
 #include "platform/PlatformLog.h"
 
 #include <atomic>

@@ -8,7 +8,7 @@
 #pragma once
 
 #include "base/Mutex.h"
-#include "platform/RunLoop.h"
+#include "platform/WorkQueue.h"
 
 #include <deque>
 #include <thread>

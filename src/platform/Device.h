@@ -2,7 +2,7 @@
 // The device as the daemon knows it: one role for each thing that it asks of the device, or tells it.
 #pragma once
 
-#include "platform/RunLoop.h"
+#include "platform/WorkQueue.h"
 
 #include <cerrno>
 #include <cstdint>
@@ -15,6 +15,8 @@
 #include <vector>
 
 namespace zor::platform {
+
+class RunLoop;
 
 // Small questions that the daemon asks of the device. All may be asked from any thread.
 

@@ -8,11 +8,13 @@
 #include "platform/Disk.h"
 #include "platform/PeerIdentity.h"
 #include "platform/PlatformLog.h"
-#include "platform/RunLoop.h"
-#include "platform/ServiceListener.h"
+#include "platform/Service.h"
+#include "platform/WorkQueue.h"
 
 namespace zor::platform {
 
+class RunLoop;
+class ServiceListener;
 class SystemRoot;
 
 /// References to objects that outlive whoever holds this.

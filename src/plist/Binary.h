@@ -10,7 +10,7 @@
 //   objects,
 //                       number of the root, place of the offset table
 //
-// The reader takes any bytes and trusts none: bounds (Limits.h), cycles, and sharing that would take more memory than
+// The reader takes any bytes and trusts none: bounds (Errors.h), cycles, and sharing that would take more memory than
 // the input pays for, end in a named error. Strings hold no NUL and are valid Unicode, so that no name can mean one
 // thing to C interfaces and another to the rest. The writer gives the same bytes for equal values, and whatever it
 // writes the reader takes. Pure functions; any thread.

@@ -15,7 +15,7 @@ struct ReadError {
     const char* reason = "";
 
     /// "byte 12: not a property list"
-    [[nodiscard]] std::string text() const;
+    [[nodiscard]] std::string text() const { return "byte " + std::to_string(offset) + ": " + reason; }
 };
 
 struct WriteError {

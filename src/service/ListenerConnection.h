@@ -13,7 +13,7 @@
 
 #include "base/Mutex.h"
 #include "platform/PeerIdentity.h"
-#include "platform/ServiceListener.h"
+#include "platform/Service.h"
 #include "service/ListenerIncidents.h"
 #include "service/ListenerInput.h"
 #include "service/ListenerOutput.h"

@@ -3,8 +3,7 @@
 #pragma once
 
 #include "base/Mutex.h"
-#include "platform/ServiceListener.h"
-#include "service/ListenerCharges.h"
+#include "platform/Service.h"
 #include "service/ListenerConnection.h"
 #include "service/ListenerIncidents.h"
 #include "service/ListenerLimits.h"

@@ -7,7 +7,7 @@
 // connection.
 #pragma once
 
-#include "service/ListenerCharges.h"
+#include "service/ListenerLimits.h"
 #include "service/ListenerPool.h"
 
 #include <cstddef>

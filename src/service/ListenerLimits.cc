@@ -2,6 +2,8 @@
 #include "service/ListenerLimits.h"
 
 #include <algorithm>
+#include <cstdio>
+#include <cstdlib>
 
 namespace zor::platform {
 
@@ -34,6 +36,92 @@ ListenerLimits ListenerLimits::forUsers(const ipc::UserNumbers& owners) const {
     if (owners.mobileUsers() > users.mobileUsers())
         limits.threadsMax += threadsMaxPerUser * (owners.mobileUsers() - users.mobileUsers());
     return limits;
+}
+
+namespace {
+
+void mustHold(bool condition, const char* what) {
+    if (!condition) {
+        std::fprintf(stderr, "listener charges: %s\n", what);
+        std::abort();
+    }
+}
+
+} // namespace
+
+ListenerCharges::~ListenerCharges() {
+    const MutexLock lock(mutex_);
+    mustHold(totals_.connections == 0, "connections do not balance");
+    mustHold(totals_.inputBytes == 0, "input bytes do not balance");
+    mustHold(totals_.outputBytes == 0, "output bytes do not balance");
+    mustHold(ofOthers_.connections == 0 && ofOthers_.inputBytes == 0 && ofOthers_.outputBytes == 0,
+             "what others have does not balance");
+}
+
+ListenerCharges::Account* ListenerCharges::openConnection(uid_t uid, bool ownsRoot) {
+    const MutexLock lock(mutex_);
+    if (totals_.connections >= limits_.connectionsMax)
+        return nullptr;
+    if (!ownsRoot && ofOthers_.connections + limits_.connectionsKeptForOwners >= limits_.connectionsMax)
+        return nullptr;
+    const unsigned threadsMax = ownsRoot ? limits_.threadsMax : std::min(limits_.threadsMaxPerUser, limits_.threadsMax);
+    Account& account =
+        accounts_.try_emplace(ownsRoot ? uid : limits_.users.counted(uid), ownsRoot, threadsMax).first->second;
+    if (!ownsRoot && account.connections >= limits_.connectionsMaxPerUser)
+        return nullptr;
+    if (!ownsRoot)
+        ++ofOthers_.connections;
+    ++account.connections;
+    ++totals_.connections;
+    return &account;
+}
+
+void ListenerCharges::closeConnection(Account& account) {
+    const MutexLock lock(mutex_);
+    mustHold(account.connections > 0, "a connection is closed twice");
+    mustHold(totals_.connections >= account.connections, "a user has more connections than there are");
+    if (!account.ownsRoot)
+        --ofOthers_.connections;
+    --totals_.connections;
+    if (--account.connections > 0)
+        return;
+    mustHold(account.inputBytes == 0, "a user's input bytes do not balance");
+    mustHold(account.outputBytes == 0, "a user's output bytes do not balance");
+}
+
+bool ListenerCharges::changeInput(Account& account, std::size_t before, std::size_t after) {
+    const MutexLock lock(mutex_);
+    mustHold(account.inputBytes >= before, "more input bytes are given back than were taken");
+    const std::size_t ofUser = account.inputBytes - before + after;
+    const std::size_t ofOthers = account.ownsRoot ? ofOthers_.inputBytes : ofOthers_.inputBytes - before + after;
+    const std::size_t inAll = totals_.inputBytes - before + after;
+    const bool tooMuchOfOthers =
+        ofUser > limits_.inputBytesMaxPerUser || ofOthers + limits_.inputBytesKeptForOwners > limits_.inputBytesMax;
+    if (after > before && (inAll > limits_.inputBytesMax || (!account.ownsRoot && tooMuchOfOthers)))
+        return false;
+    account.inputBytes = ofUser;
+    ofOthers_.inputBytes = ofOthers;
+    totals_.inputBytes = inAll;
+    return true;
+}
+
+bool ListenerCharges::changeOutput(Account& account, std::size_t before, std::size_t after) {
+    const MutexLock lock(mutex_);
+    mustHold(account.outputBytes >= before, "more output bytes are given back than were taken");
+    const std::size_t ofUser = account.outputBytes - before + after;
+    const std::size_t ofOthers = account.ownsRoot ? ofOthers_.outputBytes : ofOthers_.outputBytes - before + after;
+    const bool tooMuchOfOthers = ofUser > limits_.outputBytesMaxPerUser || ofOthers > limits_.outputBytesMaxOfOthers;
+    if (after > before && !account.ownsRoot && tooMuchOfOthers)
+        return false;
+    account.outputBytes = ofUser;
+    ofOthers_.outputBytes = ofOthers;
+    totals_.outputBytes = totals_.outputBytes - before + after;
+    return true;
+}
+
+ListenerCharges::Totals ListenerCharges::totals() const {
+    const MutexLock lock(mutex_);
+    return totals_;
 }
 
 } // namespace zor::platform

@@ -4,7 +4,7 @@
 #pragma once
 
 #include "plist/Value.h"
-#include "service/ListenerCharges.h"
+#include "service/ListenerLimits.h"
 
 #include <atomic>
 #include <cstddef>

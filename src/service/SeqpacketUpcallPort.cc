@@ -1,8 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "service/SeqpacketUpcallPort.h"
 
-#include "base/Shortage.h"
+#include "base/ErrorCode.h"
 #include "os/Names.h"
+#include "os/RunLoop.h"
 
 #include <algorithm>
 #include <cerrno>

@@ -11,7 +11,7 @@
 
 #include "os/FileDescriptor.h"
 #include "os/SystemRoot.h"
-#include "platform/ServiceListener.h"
+#include "platform/Service.h"
 #include "service/ListenerSocket.h"
 
 #include <map>

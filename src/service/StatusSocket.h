@@ -6,8 +6,8 @@
 // take the brief form is sent.
 #pragma once
 
+#include "os/RunLoop.h"
 #include "platform/PeerIdentity.h"
-#include "platform/RunLoop.h"
 #include "plist/Value.h"
 #include "service/ListenerSocket.h"
 

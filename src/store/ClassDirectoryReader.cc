@@ -3,7 +3,7 @@
 
 #include "base/Mutex.h"
 #include "fs/BulkDirectoryRead.h"
-#include "fs/Hidden.h"
+#include "fs/PathResolver.h"
 #include "fs/Stretches.h"
 
 #include <cerrno>

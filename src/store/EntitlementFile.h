@@ -2,7 +2,7 @@
 // Reading what the entitlement file holds, without a word about what follows from it. Changes nothing; any thread.
 #pragma once
 
-#include "base/Result.h"
+#include "base/ZORError.h"
 #include "fs/ZORFileManager.h"
 #include "ipc/Keys.h"
 #include "plist/Value.h"

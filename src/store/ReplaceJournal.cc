@@ -5,6 +5,7 @@
 
 #include <array>
 #include <cerrno>
+#include <utility>
 
 namespace zor {
 
@@ -98,6 +99,37 @@ void ReplaceJournal::moveToRoot(const std::string& rootPath, const FileURL& stag
 std::string ReplaceJournal::text() const {
     return "old: " + oldUrl.path() + ", new: " + newUrl.path() + ", staging: " + stagingUrl.path() +
            ", dest: " + destUrl.path();
+}
+
+using platform::MutexLock;
+
+void WaitingReplaces::add(Waiting waiting) {
+    const MutexLock held(mutex_);
+    std::erase_if(waiting_, [&](const Waiting& one) { return one.journalUrl == waiting.journalUrl; });
+    waiting_.push_back(std::move(waiting));
+    update();
+}
+
+void WaitingReplaces::remove(const FileURL& journalUrl) {
+    const MutexLock held(mutex_);
+    std::erase_if(waiting_, [&](const Waiting& one) { return one.journalUrl == journalUrl; });
+    update();
+}
+
+std::vector<WaitingReplaces::Waiting> WaitingReplaces::all() const {
+    const MutexLock held(mutex_);
+    return waiting_;
+}
+
+bool WaitingReplaces::unlisted() const {
+    const MutexLock held(mutex_);
+    return unlisted_;
+}
+
+void WaitingReplaces::setUnlisted(bool unlisted) {
+    const MutexLock held(mutex_);
+    unlisted_ = unlisted;
+    update();
 }
 
 } // namespace zor

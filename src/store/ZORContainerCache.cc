@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ZORContainerCache.h"
 
-#include "fs/Hidden.h"
+#include "fs/PathResolver.h"
 #include "plist/Value.h"
 #include "store/Names.h"
 

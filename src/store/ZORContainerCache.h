@@ -17,7 +17,7 @@
 
 #include "base/ContainerClass.h"
 #include "base/Mutex.h"
-#include "base/Result.h"
+#include "base/ZORError.h"
 #include "base/ZORException.h"
 #include "fs/Durability.h"
 #include "store/ZORGlobalConfiguration.h"

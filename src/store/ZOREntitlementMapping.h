@@ -16,7 +16,7 @@
 #pragma once
 
 #include "base/Mutex.h"
-#include "base/Result.h"
+#include "base/ZORError.h"
 #include "base/ZORLocks.h"
 #include "plist/Value.h"
 #include "store/EntitlementFile.h"

@@ -3,7 +3,7 @@
 
 #include "fs/AtomicFile.h"
 #include "fs/DictionaryFile.h"
-#include "fs/Hidden.h"
+#include "fs/PathResolver.h"
 #include "ipc/Identifier.h"
 #include "ipc/Keys.h"
 #include "plist/Binary.h"

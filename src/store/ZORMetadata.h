@@ -10,9 +10,9 @@
 
 #include "base/ContainerClass.h"
 #include "base/FileURL.h"
-#include "base/Result.h"
-#include "base/UUID.h"
+#include "base/ZORError.h"
 #include "fs/ZORFileManager.h"
+#include "ipc/UUID.h"
 #include "plist/Value.h"
 
 #include <array>

@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ZORWhitelist.h"
 
-#include "base/UUID.h"
 #include "fs/AtomicFile.h"
 #include "fs/DictionaryFile.h"
+#include "ipc/UUID.h"
 #include "os/Names.h"
 
 #include <algorithm>

@@ -9,14 +9,13 @@
 // packets. No packet can end the daemon: what is thrown ends at this class.
 #pragma once
 
-#include "base/Result.h"
+#include "base/ZORError.h"
 #include "base/ZORException.h"
 #include "fs/ZORFileManager.h"
 #include "operations/Creation.h"
-#include "platform/ServiceListener.h"
+#include "platform/Service.h"
 #include "store/ZORGlobalConfiguration.h"
-#include "upcall/ProcessContainersReply.h"
-#include "upcall/ProcessContainersRequest.h"
+#include "upcall/ProcessContainers.h"
 
 #include <optional>
 #include <string>

@@ -1,7 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "check/StoreCheck.h"
 #include "check/Repair.h"
-#include "check/ShellText.h"
 #include "store/EntitlementFile.h"
 #include "support/EncryptedDisk.h"
 #include "support/FileTree.h"

@@ -3,7 +3,7 @@
 #include "ipc/ContainerClasses.h"
 #include "ipc/Frame.h"
 #include "ipc/Keys.h"
-#include "ipc/Uuid.h"
+#include "ipc/UUID.h"
 #include "support/FakeServer.h"
 #include "support/Frames.h"
 #include "zorvane/Text.h"

@@ -4,8 +4,8 @@
 #include "device/LinkSandboxUserState.h"
 #include "device/SemaphoreBootMarker.h"
 #include "device/XattrProtectionClass.h"
-#include "os/EpollRunLoop.h"
 #include "os/Names.h"
+#include "os/RunLoop.h"
 #include "support/FewDescriptors.h"
 #include "support/TestRoot.h"
 #include "support/Waiting.h"
@@ -251,7 +251,7 @@ TEST(FileProtectionClass, RefusesWhatALockTakesAway) {
 // cannot be opened is not missed. Method: the file changes, at last without a descriptor left, and never again.
 TEST(WantOfDescriptors, AnUnlockIsSeenAfterwards) {
     const TestRoot test;
-    EpollRunLoop loop;
+    RunLoop loop;
     FileDeviceLockState state(test.root());
     std::atomic<int> seen{-2};
     ASSERT_EQ(state.registerForChanges(loop, [&] { seen = state.currentState(); }), 0);
@@ -287,7 +287,7 @@ TEST(WantOfNotices, AnUnlockIsSeenAllTheSame) {
         };
         if (::unshare(CLONE_NEWUSER) != 0 || !allowNotices("0"))
             ::_exit(cannot);
-        EpollRunLoop loop;
+        RunLoop loop;
         FileDeviceLockState state(test.root());
         std::atomic<int> seen{FileDeviceLockState::unknown};
         std::atomic<int> looks{0};

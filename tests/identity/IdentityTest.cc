@@ -1,10 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 // Peers are real processes that run copies of real programs; the registry is files in a root of the test's own.
-#include "identity/CgroupUnit.h"
 #include "identity/IdentityFile.h"
 #include "identity/LinuxPasswordDatabase.h"
+#include "identity/LinuxPeerIdentity.h"
 #include "identity/PeerProcess.h"
-#include "os/EpollRunLoop.h"
+#include "os/RunLoop.h"
 #include "service/SeqpacketUpcallPort.h"
 #include "support/Files.h"
 #include "support/Frames.h"
@@ -180,7 +180,7 @@ TEST(IdentityRegistry, IgnoresWhatMayBeForged) {
 // Every way of changing the registry or an executable reaches a live connection through the loop.
 TEST(IdentityRegistry, FollowsChanges) {
     PeerWorld world;
-    EpollRunLoop loop;
+    RunLoop loop;
     ASSERT_TRUE(world.registry.follow(loop));
     std::thread runner([&] { loop.run(); });
     const PeerProcess process(world.server, world.program("agent"));
@@ -304,7 +304,7 @@ TEST(WantOfDescriptors, APeerIsRefusedAndNotMistaken) {
     }
     EXPECT_EQ(who(*peer), "old");
 
-    EpollRunLoop loop;
+    RunLoop loop;
     SeqpacketUpcallPort port(world.test.root(), world.identity, {});
     ASSERT_EQ(port.checkIn(), 0);
     ASSERT_TRUE(port.serve(loop, [](const UpcallPacket&) { return std::vector<std::uint8_t>(); }));

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "ipc/Frame.h"
 #include "ipc/Keys.h"
-#include "ipc/Uuid.h"
+#include "ipc/UUID.h"
 
 #include <gtest/gtest.h>
 
@@ -51,25 +51,24 @@ TEST(Frame, WhatEachSideTakes) {
 
 // A UUID is 16 bytes of data or nothing, and its text is exact.
 TEST(Uuid, ValuesAndText) {
-    const UuidBytes uuid = {0x00, 0x11, 0x22, 0x33, 0x44, 0x55, 0x66, 0x77,
-                            0x88, 0x99, 0xAA, 0xBB, 0xCC, 0xDD, 0xEE, 0xFF};
-    const plist::Value value = uuidValue(uuid);
-    EXPECT_EQ(uuidOf(&value), uuid);
+    const UUID uuid({0x00, 0x11, 0x22, 0x33, 0x44, 0x55, 0x66, 0x77, 0x88, 0x99, 0xAA, 0xBB, 0xCC, 0xDD, 0xEE, 0xFF});
+    const plist::Value value = uuid.value();
+    EXPECT_EQ(UUID::of(&value), uuid);
     for (const plist::Value& other : std::initializer_list<plist::Value>{
              plist::Data(15), plist::Data(17), plist::Data(), "0011223344556677", std::uint64_t{1}, plist::Array()})
-        EXPECT_FALSE(uuidOf(&other));
-    EXPECT_FALSE(uuidOf(nullptr));
-    EXPECT_FALSE(uuidOf({{"A", value}}, "B"));
+        EXPECT_FALSE(UUID::of(&other));
+    EXPECT_FALSE(UUID::of(nullptr));
+    EXPECT_FALSE(UUID::of(plist::Dictionary{{"A", value}}, "B"));
 
     const std::string text = "00112233-4455-6677-8899-AABBCCDDEEFF";
-    EXPECT_EQ(uuidText(uuid), text);
-    EXPECT_EQ(uuidOfText(text), uuid);
-    EXPECT_EQ(uuidOfText("00112233-4455-6677-8899-aabbccddeeff"), uuid);
+    EXPECT_EQ(uuid.string(), text);
+    EXPECT_EQ(UUID::parse(text), uuid);
+    EXPECT_EQ(UUID::parse("00112233-4455-6677-8899-aabbccddeeff"), uuid);
     for (const char* wrong : {"", "00112233445566778899AABBCCDDEEFF", "00112233-4455-6677-8899-AABBCCDDEEF",
                               "00112233-4455-6677-8899-AABBCCDDEEFF0", "0011223-34455-6677-8899-AABBCCDDEEFF",
                               "00112233-4455-6677-8899-AABBCCDDEEFG", "0011223344-55-6677-8899-AABBCCDDEEFF",
                               "00112233-4455-6677-8899+AABBCCDDEEFF", "{0112233-4455-6677-8899-AABBCCDDEEFF"})
-        EXPECT_FALSE(uuidOfText(wrong)) << wrong;
+        EXPECT_FALSE(UUID::parse(wrong)) << wrong;
 }
 
 static_assert(static_cast<std::uint64_t>(Command::retryTest) + 1 == commandCount);

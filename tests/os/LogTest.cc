@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "base/LogSubject.h"
+#include "base/Log.h"
 #include "base/ZORError.h"
 #include "os/RotatingLog.h"
 #include "plist/Text.h"

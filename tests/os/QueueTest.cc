@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "os/EpollRunLoop.h"
-#include "os/NotifySocket.h"
+#include "os/RunLoop.h"
 #include "os/SerialWorkQueue.h"
+#include "os/ServiceManager.h"
 #include "support/Frames.h"
 #include "support/TestRoot.h"
 #include "support/Waiting.h"
@@ -84,8 +84,8 @@ TEST(SerialWorkQueue, FinishesOrDropsWhatIsQueued) {
 
 // A callback that unwatches another one whose event is already fetched prevents it; a descriptor number that is used
 // again is not mistaken for the old one.
-TEST(EpollRunLoop, CallsOnlyWhatIsStillWatched) {
-    EpollRunLoop loop;
+TEST(RunLoop, CallsOnlyWhatIsStillWatched) {
+    RunLoop loop;
     FileDescriptor first(::eventfd(1, EFD_CLOEXEC | EFD_NONBLOCK));
     FileDescriptor second(::eventfd(1, EFD_CLOEXEC | EFD_NONBLOCK));
     std::vector<std::string> calls;

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // A root, the disk below it, and the one daemon on it.
-#include "os/DaemonLock.h"
+#include "os/SystemRoot.h"
 #include "support/TestRoot.h"
 
 #include <csignal>

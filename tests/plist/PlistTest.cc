@@ -3,7 +3,6 @@
 // both that want to crash the reader, keep it busy or fill the memory.
 #include "plist/Binary.h"
 #include "plist/Read.h"
-#include "plist/Xml.h"
 #include "support/Allocations.h"
 
 #include <cmath>

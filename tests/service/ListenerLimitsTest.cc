@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "service/ListenerCharges.h"
+#include "service/ListenerLimits.h"
 #include "service/ListenerPool.h"
 #include "service/ListenerWorld.h"
 #include "support/Allocations.h"

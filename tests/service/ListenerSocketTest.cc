@@ -4,9 +4,9 @@
 // closes the socket in which they lie unread. Method of that: TCP sockets that linger for twenty seconds, because
 // nobody reads at their far end; they are sent before the listening socket comes to the listener, for after that newer
 // kernels refuse them.
-#include "os/EpollRunLoop.h"
+#include "os/RunLoop.h"
+#include "os/ServiceManager.h"
 #include "service/ListenerWorld.h"
-#include "service/PassedSockets.h"
 #include "service/SeqpacketUpcallPort.h"
 #include "service/StatusSocket.h"
 #include "support/TestRoot.h"
@@ -37,7 +37,7 @@ TEST(ListenerSocket, IsMadeAtAnyPathWithItsMode) {
         EXPECT_EQ(directory.modeOfSocket(), static_cast<mode_t>(S_IFSOCK | 0600));
         ListenerOptions options;
         options.address = directory.address();
-        LinuxServiceListener listener(identity, std::move(options));
+        ServiceListener listener(identity, std::move(options));
         ASSERT_TRUE(listener.resume(echo));
         EXPECT_EQ(directory.modeOfSocket(), static_cast<mode_t>(S_IFSOCK | 0666));
         EXPECT_TRUE(RawClient(directory.socketPath()).isServed());
@@ -54,7 +54,7 @@ TEST(ListenerSocket, PassedSocketsAreCheckedAndServed) {
     const auto listenerWith = [&](int passed) {
         ListenerOptions options;
         options.passed.reset(passed);
-        return std::make_unique<LinuxServiceListener>(identity, std::move(options));
+        return std::make_unique<ServiceListener>(identity, std::move(options));
     };
     for (const int wrong : {
              ::open("/dev/null", O_RDWR | O_CLOEXEC),
@@ -102,7 +102,7 @@ public:
     const SocketDirectory directory{150};
 
 private:
-    EpollRunLoop loop_;
+    RunLoop loop_;
     StatusSocket status_;
     std::thread thread_{[this] { loop_.run(); }};
 };
@@ -338,7 +338,7 @@ private:
     }
 
     support::TestRoot test_;
-    EpollRunLoop loop_;
+    RunLoop loop_;
     SeqpacketUpcallPort before_{test_.root(), identity};
     SeqpacketUpcallPort port_{test_.root(), identity};
     std::thread thread_;

@@ -5,7 +5,7 @@
 
 #include "base/BlockingScope.h"
 #include "plist/Binary.h"
-#include "service/LinuxServiceListener.h"
+#include "service/ServiceListener.h"
 #include "support/FewDescriptors.h"
 #include "support/FileTree.h"
 #include "support/Files.h"
@@ -204,7 +204,7 @@ public:
             const std::lock_guard lock(mutex_);
             reports_.emplace_back(line);
         };
-        listener_ = std::make_unique<LinuxServiceListener>(identity, std::move(options));
+        listener_ = std::make_unique<ServiceListener>(identity, std::move(options));
         EXPECT_TRUE(listener_->resume([this](PeerConnection& connection, ServiceEvent& event) {
             {
                 const std::lock_guard lock(mutex_);
@@ -283,7 +283,7 @@ private:
     std::mutex mutex_;
     std::set<const PeerConnection*> inHandler_;
     std::vector<std::string> reports_;
-    std::unique_ptr<LinuxServiceListener> listener_;
+    std::unique_ptr<ServiceListener> listener_;
 };
 
 } // namespace zor::platform

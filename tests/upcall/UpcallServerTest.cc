@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "upcall/UpcallServer.h"
 
-#include "upcall/ProcessContainersReply.h"
+#include "upcall/ProcessContainers.h"
 #include "upcall/UpcallWorld.h"
 
 #include <sys/wait.h>

@@ -2,7 +2,7 @@
 #include "Options.h"
 
 #include "Failure.h"
-#include "identity/UserNumber.h"
+#include "identity/UserConfiguration.h"
 
 #include <getopt.h>
 

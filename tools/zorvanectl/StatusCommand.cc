@@ -4,7 +4,7 @@
 #include "ContainerLists.h"
 #include "RegisteredEntitlements.h"
 #include "check/CheckedSystem.h"
-#include "check/DeathRow.h"
+#include "check/WorkCheck.h"
 
 #include <algorithm>
 #include <array>

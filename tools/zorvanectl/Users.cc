@@ -2,7 +2,7 @@
 #include "Users.h"
 
 #include "identity/LinuxPasswordDatabase.h"
-#include "identity/UserNumber.h"
+#include "identity/UserConfiguration.h"
 #include "os/SystemRoot.h"
 #include "zorvane/Client.h"
 

@@ -1,8 +1,11 @@
 // SPDX-License-Identifier: Apache-2.0
 // Creating or finding a container, listing a class, emptying death row.
+// What is attached to one container: its info values and its record.
+// Changing the data-protection class of a container. It replies itself, when the change has ended.
+
 #include "daemon/commands/Commands.h"
 #include "daemon/commands/Request.h"
-#include "ipc/Uuid.h"
+#include "ipc/UUID.h"
 
 namespace zor::commands {
 
@@ -33,7 +36,7 @@ void replyWithList(CommandContext& context, const std::vector<ZORClientConnectio
     uuids.reserve(containers.size());
     for (const auto& container : containers) {
         identifiers.emplace_back(container.identifier);
-        uuids.push_back(ipc::uuidValue(container.uuid.bytes()));
+        uuids.push_back(container.uuid.value());
     }
     context.reply.set(keys::replyIdsArray, std::move(identifiers));
     context.reply.set(keys::replyUUIDsArray, std::move(uuids));
@@ -63,7 +66,7 @@ void createOrLookupContainer(CommandContext& context) {
     reply.emplace_back(keys::replyExisted, found->existed);
     reply.emplace_back(keys::replyIdentifier, found->record->identifier());
     reply.emplace_back(keys::replyPath, std::move(found->path));
-    reply.emplace_back(keys::replyUUID, ipc::uuidValue(found->uuid.bytes()));
+    reply.emplace_back(keys::replyUUID, found->uuid.value());
     context.reply = plist::Dictionary::fromUnsorted(std::move(reply));
 }
 
@@ -96,6 +99,73 @@ void deleteContainersOnDeathRow(CommandContext& context) {
     context.client->deleteContainersOnDeathRowWithCompletion([channel = context.channel](ErrorCode code) {
         channel->send({{std::string(keys::replyError), static_cast<std::uint64_t>(code)}});
     });
+}
+
+namespace keys = ipc::keys;
+
+void setInfoValue(CommandContext& context) {
+    if (const auto address = addressIn(context))
+        storeError(context, context.client->setInfoValue(context.request.find(keys::value),
+                                                         context.request.string(keys::key), *address, UseLocking::yes));
+}
+
+void getInfoValue(CommandContext& context) {
+    const auto address = addressIn(context);
+    if (!address)
+        return;
+    auto value = context.client->infoValueForKey(context.request.string(keys::key), *address, UseLocking::yes);
+    if (value)
+        context.reply.set(keys::replyInfoValue, std::move(*value));
+    else
+        context.error = value.error().replyCode();
+}
+
+void getMetadata(CommandContext& context) {
+    const auto address = addressIn(context);
+    if (!address)
+        return;
+    const auto metadata = context.client->metadataForUser(*address);
+    if (!metadata) {
+        context.error = metadata.error().replyCode();
+        return;
+    }
+    context.reply.set(keys::replyPath, metadata->path);
+    context.reply.set(keys::replyTransient, metadata->transient);
+    if (context.request.isTrue(keys::infoDictRequested) && metadata->info)
+        context.reply.set(keys::replyInfoDictionary, *metadata->info);
+}
+
+namespace keys = ipc::keys;
+
+namespace {
+
+/// The low 32 bits of a signed number; what is missing or of another type reads as 0.
+std::int32_t protectionClassIn(const plist::Dictionary& request) {
+    const plist::Value* value = request.find(keys::dataProtectionClass);
+    return static_cast<std::int32_t>(value ? value->asSigned().value_or(0) : 0);
+}
+
+} // namespace
+
+void setDataProtection(CommandContext& context) {
+    const auto reply = [channel = context.channel](ErrorCode code) {
+        channel->send({{std::string(keys::replyError), static_cast<std::uint64_t>(code)}});
+    };
+    const ContainerClass containerClass = classOf(context.request, keys::containerClass);
+    const auto user = userOf(context, keys::userId, containerClass);
+    if (!user) {
+        reply(context.error);
+        return;
+    }
+    context.operations.dataProtection.setDataProtectionOnDataContainerForUser(
+        {.userId = *user,
+         .identifier = stringIn(context.request, keys::identifier),
+         .containerClass = containerClass,
+         .dataProtectionClass = protectionClassIn(context.request),
+         .isSecondOrThirdPartyApp = context.request.isTrue(keys::isThirdParty),
+         .retryIfLocked = context.request.isTrue(keys::retryIfLocked),
+         .byOwner = context.client->ownsRoot()},
+        reply);
 }
 
 } // namespace zor::commands

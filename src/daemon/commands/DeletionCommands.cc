@@ -2,7 +2,7 @@
 // Taking containers out of the store: a list of them, or the one of an identifier.
 #include "daemon/commands/Commands.h"
 #include "daemon/commands/Request.h"
-#include "ipc/Uuid.h"
+#include "ipc/UUID.h"
 
 #include <algorithm>
 
@@ -22,7 +22,7 @@ const plist::Array& arrayOf(const plist::Dictionary& request, std::string_view k
 bool listsAreUsable(CommandContext& context, const plist::Array& classes, const plist::Array& uuids) {
     const std::size_t users = arrayOf(context.request, keys::userIdsArray).size();
     const auto isUnsigned = [](const plist::Value& element) { return element.asUnsigned().has_value(); };
-    const auto isUuid = [](const plist::Value& element) { return ipc::uuidOf(&element).has_value(); };
+    const auto isUuid = [](const plist::Value& element) { return UUID::of(&element).has_value(); };
     if (users <= classes.size() && std::ranges::all_of(classes, isUnsigned) && std::ranges::all_of(uuids, isUuid))
         return true;
     makeError(context.log, {"stageContainerForDelete", __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
@@ -59,7 +59,7 @@ void stageContainersForDelete(CommandContext& context) {
     for (const plist::Value& element : classes)
         batch.classes.emplace_back(element.asUnsigned().value_or(0));
     for (const plist::Value& element : uuids)
-        batch.uuids.emplace_back(UUID(*ipc::uuidOf(&element)));
+        batch.uuids.emplace_back(*UUID::of(&element));
     const plist::Array* identifiers = context.request.array(keys::identifiersArray);
     if (!identifiers)
         context.log.write(logLevelError, "stageContainerForDelete", "Got non-Array input for the identifiers array");

@@ -21,7 +21,7 @@ void wipe(CommandContext& context, ContainerClass containerClass) {
 void replaceContainer(CommandContext& context) {
     const plist::Dictionary& request = context.request;
     ZORClientConnection::ReplaceRequest replace;
-    replace.oldUuid = uuidIn(request, keys::oldContainerUUID);
+    replace.oldUuid = UUID::of(request, keys::oldContainerUUID);
     if (replace.oldUuid) {
         replace.classOld = classOf(request, keys::oldContainerClass);
         replace.identifierOld = stringIn(request, keys::oldIdentifier);
@@ -35,7 +35,7 @@ void replaceContainer(CommandContext& context) {
     if (!user)
         return;
     replace.userIdNew = *user;
-    replace.newUuid = uuidIn(request, keys::newContainerUUID);
+    replace.newUuid = UUID::of(request, keys::newContainerUUID);
     replace.identifierNew = stringIn(request, keys::newIdentifier);
     storeError(context, context.client->replaceContainer(replace, StartDeletionThread::no));
 }

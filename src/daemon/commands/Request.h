@@ -3,7 +3,7 @@
 #pragma once
 
 #include "daemon/CommandTable.h"
-#include "ipc/Uuid.h"
+#include "ipc/UUID.h"
 
 #include <cstdint>
 #include <optional>
@@ -62,11 +62,6 @@ namespace zor::commands {
     return text ? std::optional(*text) : std::nullopt;
 }
 
-[[nodiscard]] inline std::optional<UUID> uuidIn(const plist::Dictionary& request, std::string_view key) {
-    const auto bytes = ipc::uuidOf(request, key);
-    return bytes ? std::optional(UUID(*bytes)) : std::nullopt;
-}
-
 /// The one container that the request names by its UUID. Without a valid user the context has its error.
 [[nodiscard]] inline std::optional<ZORClientConnection::ContainerAddress> addressIn(CommandContext& context) {
     const ContainerClass containerClass = classOf(context.request, ipc::keys::containerClass);
@@ -74,7 +69,7 @@ namespace zor::commands {
     if (!user)
         return std::nullopt;
     return ZORClientConnection::ContainerAddress{.userId = *user,
-                                                 .uuid = uuidIn(context.request, ipc::keys::uuid),
+                                                 .uuid = UUID::of(context.request, ipc::keys::uuid),
                                                  .identifier = stringIn(context.request, ipc::keys::identifier),
                                                  .containerClass = containerClass};
 }

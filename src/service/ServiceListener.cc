@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "service/LinuxServiceListener.h"
+#include "service/ServiceListener.h"
 
-#include "base/Shortage.h"
+#include "base/ErrorCode.h"
 #include "service/ListenerCore.h"
 
 #include <cerrno>
@@ -25,7 +25,7 @@ constexpr std::chrono::milliseconds acceptPause{100};
 } // namespace
 
 /// The listening socket as a task of the pool. One thread at a time.
-class LinuxServiceListener::Acceptance final : public ListenerTask {
+class ServiceListener::Acceptance final : public ListenerTask {
 public:
     Acceptance(int socket, PeerIdentity& identity, ListenerCore& core)
         : ListenerTask(&line_), socket_(socket), identity_(identity), core_(core) {}
@@ -99,7 +99,7 @@ private:
 };
 
 /// Shows that the pool serves: a question that a worker takes, in the turn of the owners of the root.
-class LinuxServiceListener::Probe final : public ListenerTask {
+class ServiceListener::Probe final : public ListenerTask {
 public:
     explicit Probe(ListenerPool& pool) : ListenerTask(&line_), pool_(pool) {}
 
@@ -125,14 +125,14 @@ private:
     std::atomic<bool> asked_{false};
 };
 
-LinuxServiceListener::LinuxServiceListener(PeerIdentity& identity, ListenerOptions options)
+ServiceListener::ServiceListener(PeerIdentity& identity, ListenerOptions options)
     : identity_(identity), options_(std::move(options)) {}
 
-LinuxServiceListener::~LinuxServiceListener() {
+ServiceListener::~ServiceListener() {
     stop();
 }
 
-bool LinuxServiceListener::resume(ServiceHandler handler) {
+bool ServiceListener::resume(ServiceHandler handler) {
     const int error = begin(std::move(handler));
     if (error == 0)
         return true;
@@ -142,7 +142,7 @@ bool LinuxServiceListener::resume(ServiceHandler handler) {
     return false;
 }
 
-int LinuxServiceListener::begin(ServiceHandler handler) {
+int ServiceListener::begin(ServiceHandler handler) {
     if (const int error = takeSocket(); error != 0)
         return error;
     if (const int error = enableSenderCredentials(socket_.get()); error != 0)
@@ -156,11 +156,11 @@ int LinuxServiceListener::begin(ServiceHandler handler) {
     return core_->pool.add(socket_.get(), *acceptance_, EPOLLIN | EPOLLONESHOT) && probe_->start() ? 0 : errno;
 }
 
-bool LinuxServiceListener::answers() {
+bool ServiceListener::answers() {
     return probe_ && probe_->answers();
 }
 
-int LinuxServiceListener::takeSocket() {
+int ServiceListener::takeSocket() {
     if (options_.passed.valid()) {
         socket_ = PeerSocket(std::move(options_.passed));
         return adoptListenerSocket(socket_.get(), SOCK_STREAM);
@@ -173,7 +173,7 @@ int LinuxServiceListener::takeSocket() {
     return 0;
 }
 
-void LinuxServiceListener::stop() {
+void ServiceListener::stop() {
     if (std::exchange(socketIsOurs_, false))
         ::unlinkat(options_.address.directory, options_.address.name.c_str(), 0);
     if (core_) {
@@ -189,7 +189,7 @@ void LinuxServiceListener::stop() {
     socket_.reset();
 }
 
-ListenerCounters LinuxServiceListener::counters() const {
+ListenerCounters ServiceListener::counters() const {
     if (!core_)
         return {};
     const ListenerCharges::Totals totals = core_->charges.totals();

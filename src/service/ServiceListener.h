@@ -4,15 +4,15 @@
 // The thread that finds a connection readable reads the frames, calls the handler and sends the reply itself. Memory
 // and connections are bounded (ListenerLimits.h); no peer can make a thread wait.
 //
-// ListenerAcceptor      who gets in                 ListenerConnection   one peer: frames in, replies out
+// ListenerSocket        who gets in                   ListenerConnection   one peer: frames in, replies out
 // ListenerPool          the threads, one epoll      ListenerInput/Output its buffers
 // ListenerTurns         whose turn it is
-// ListenerCharges       who uses how much           ListenerIncidents    what is counted and logged
+// ListenerLimits        who may use how much        ListenerIncidents    what is counted and logged
 // PassedAlong           descriptors sent by peers
 #pragma once
 
 #include "platform/PeerIdentity.h"
-#include "platform/ServiceListener.h"
+#include "platform/Service.h"
 #include "service/ListenerIncidents.h"
 #include "service/ListenerLimits.h"
 #include "service/ListenerSocket.h"
@@ -49,16 +49,19 @@ struct ListenerCounters {
     std::uint64_t threadsMost = 0;
 };
 
-class LinuxServiceListener final : public ServiceListener {
+class ServiceListener {
 public:
-    LinuxServiceListener(PeerIdentity& identity, ListenerOptions options);
-    ~LinuxServiceListener() override;
+    ServiceListener(PeerIdentity& identity, ListenerOptions options);
+    ~ServiceListener();
+    ServiceListener(const ServiceListener&) = delete;
+    ServiceListener& operator=(const ServiceListener&) = delete;
 
-    /// Once. errno tells why when it is false; nobody can connect to a socket of its own then.
-    bool resume(ServiceHandler handler) override;
-    /// Each connection that is still open gets its invalid event from the calling thread. Replies that come later go
-    /// nowhere.
-    void stop() override;
+    /// Begins to accept and serve. Once. errno tells why when it is false; nobody can connect to a socket of its own
+    /// then.
+    [[nodiscard]] bool resume(ServiceHandler handler);
+    /// Stops accepting, ends every connection and joins the threads. Each connection that is still open gets its
+    /// invalid event from the calling thread. Replies that come later go nowhere.
+    void stop();
 
     /// Whether the pool has taken the question of the last call; asks it anew. For one thread that calls it now and
     /// then, between resume and stop.

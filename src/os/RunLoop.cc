@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "os/EpollRunLoop.h"
+#include "os/RunLoop.h"
 
 #include <algorithm>
 #include <array>
@@ -27,7 +27,7 @@ int checkedDescriptor(int fd, const char* what) {
 
 } // namespace
 
-EpollRunLoop::EpollRunLoop()
+RunLoop::RunLoop()
     : epoll_(checkedDescriptor(::epoll_create1(EPOLL_CLOEXEC), "epoll_create1")),
       wake_(checkedDescriptor(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK), "eventfd")) {
     epoll_event event{};
@@ -36,7 +36,7 @@ EpollRunLoop::EpollRunLoop()
     checkedDescriptor(::epoll_ctl(epoll_.get(), EPOLL_CTL_ADD, wake_.get(), &event), "epoll_ctl");
 }
 
-bool EpollRunLoop::watch(int fd, std::function<void()> ready) {
+bool RunLoop::watch(int fd, std::function<void()> ready) {
     const MutexLock lock(mutex_);
     epoll_event event{};
     event.events = EPOLLIN;
@@ -47,7 +47,7 @@ bool EpollRunLoop::watch(int fd, std::function<void()> ready) {
     return true;
 }
 
-void EpollRunLoop::unwatch(int fd) {
+void RunLoop::unwatch(int fd) {
     // An object that a callback holds may unwatch in its turn when it goes: it goes after the lock.
     std::shared_ptr<std::function<void()>> gone;
     const MutexLock lock(mutex_);
@@ -61,7 +61,7 @@ void EpollRunLoop::unwatch(int fd) {
     }
 }
 
-void EpollRunLoop::post(std::function<void()> job) {
+void RunLoop::post(std::function<void()> job) {
     {
         const MutexLock lock(mutex_);
         posted_.push_back(std::move(job));
@@ -69,14 +69,14 @@ void EpollRunLoop::post(std::function<void()> job) {
     wake();
 }
 
-unsigned EpollRunLoop::addTimer(std::function<void()> job) {
+unsigned RunLoop::addTimer(std::function<void()> job) {
     auto shared = std::make_shared<std::function<void()>>(std::move(job));
     const MutexLock lock(mutex_);
     timers_[++lastTimer_] = {.job = std::move(shared), .due = {}};
     return lastTimer_;
 }
 
-void EpollRunLoop::removeTimer(unsigned timer) {
+void RunLoop::removeTimer(unsigned timer) {
     // As with a watch: what the job holds goes after the lock.
     std::shared_ptr<std::function<void()>> gone;
     const MutexLock lock(mutex_);
@@ -86,7 +86,7 @@ void EpollRunLoop::removeTimer(unsigned timer) {
     }
 }
 
-void EpollRunLoop::setTimer(unsigned timer, std::chrono::milliseconds delay) {
+void RunLoop::setTimer(unsigned timer, std::chrono::milliseconds delay) {
     const auto due = std::chrono::steady_clock::now() + delay;
     {
         const MutexLock lock(mutex_);
@@ -98,7 +98,7 @@ void EpollRunLoop::setTimer(unsigned timer, std::chrono::milliseconds delay) {
     wake();
 }
 
-int EpollRunLoop::millisecondsToNextTimer() {
+int RunLoop::millisecondsToNextTimer() {
     std::optional<std::chrono::steady_clock::time_point> next;
     {
         const MutexLock lock(mutex_);
@@ -111,7 +111,7 @@ int EpollRunLoop::millisecondsToNextTimer() {
     return static_cast<int>(std::clamp<std::int64_t>(left, 0, std::numeric_limits<int>::max()));
 }
 
-void EpollRunLoop::runDueTimers() {
+void RunLoop::runDueTimers() {
     const auto now = std::chrono::steady_clock::now();
     for (;;) {
         std::shared_ptr<std::function<void()>> job;
@@ -128,12 +128,12 @@ void EpollRunLoop::runDueTimers() {
     }
 }
 
-void EpollRunLoop::stop() {
+void RunLoop::stop() {
     stop_.store(true, std::memory_order_release);
     wake();
 }
 
-void EpollRunLoop::run() {
+void RunLoop::run() {
     constexpr int eventsMax = 32;
     std::array<epoll_event, eventsMax> events{};
     while (!stop_.exchange(false, std::memory_order_acq_rel)) {
@@ -152,13 +152,13 @@ void EpollRunLoop::run() {
     }
 }
 
-std::shared_ptr<std::function<void()>> EpollRunLoop::callbackOf(std::uint64_t serial) {
+std::shared_ptr<std::function<void()>> RunLoop::callbackOf(std::uint64_t serial) {
     const MutexLock lock(mutex_);
     const auto found = watches_.find(serial);
     return found == watches_.end() ? nullptr : found->second.ready;
 }
 
-void EpollRunLoop::runPosted() {
+void RunLoop::runPosted() {
     std::vector<std::function<void()>> jobs;
     {
         const MutexLock lock(mutex_);
@@ -170,13 +170,13 @@ void EpollRunLoop::runPosted() {
     }
 }
 
-void EpollRunLoop::wake() {
+void RunLoop::wake() {
     const std::uint64_t one = 1;
     // It fails only when the count is full, and then the loop wakes anyway.
     (void)!::write(wake_.get(), &one, sizeof one);
 }
 
-void EpollRunLoop::drainWake() {
+void RunLoop::drainWake() {
     std::uint64_t count = 0;
     (void)!::read(wake_.get(), &count, sizeof count);
 }

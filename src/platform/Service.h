@@ -3,7 +3,7 @@
 #pragma once
 
 #include "platform/PeerIdentity.h"
-#include "platform/RunLoop.h"
+#include "platform/WorkQueue.h"
 #include "plist/Value.h"
 
 #include <cstddef>
@@ -16,6 +16,8 @@
 #include <vector>
 
 namespace zor::platform {
+
+class RunLoop;
 
 // The named service: connections, frames, replies. The meaning of a message is the handler's business.
 
@@ -55,15 +57,6 @@ public:
 
 /// Called for each event of each connection: one at a time for one connection, in parallel for different ones.
 using ServiceHandler = std::function<void(PeerConnection&, ServiceEvent&)>;
-
-class ServiceListener {
-public:
-    virtual ~ServiceListener() = default;
-    /// Begins to accept and serve. False when the service cannot be made.
-    virtual bool resume(ServiceHandler handler) = 0;
-    /// Stops accepting, ends every connection and joins the threads.
-    virtual void stop() = 0;
-};
 
 // The kernel's port: packets with the sender's credentials, and replies.
 

@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// The main thread's loop over epoll.
+// The main thread's loop, over epoll: descriptors that become readable, jobs posted from other threads, and timers, one
+// after the other.
 //
 // watch, unwatch and post may be called from any thread, and from what the loop calls. After an unwatch on the loop's
 // thread its callback is not called again; an unwatch from elsewhere does not wait for a callback that is running. A
@@ -8,32 +9,42 @@
 
 #include "base/Mutex.h"
 #include "os/FileDescriptor.h"
-#include "platform/RunLoop.h"
 
 #include <atomic>
 #include <chrono>
 #include <cstdint>
+#include <functional>
 #include <initializer_list>
 #include <map>
 #include <memory>
 #include <optional>
+#include <utility>
 #include <vector>
 
 namespace zor::platform {
 
-class EpollRunLoop final : public RunLoop {
+class RunLoop {
 public:
     /// Throws std::system_error when the system gives no descriptors.
-    EpollRunLoop();
+    RunLoop();
 
-    bool watch(int fd, std::function<void()> ready) override;
-    void unwatch(int fd) override;
-    void post(std::function<void()> job) override;
-    unsigned addTimer(std::function<void()> job) override;
-    void removeTimer(unsigned timer) override;
-    void setTimer(unsigned timer, std::chrono::milliseconds delay) override;
-    void run() override;
-    void stop() override;
+    /// Calls `ready` on the loop's thread whenever `fd` is readable. The caller keeps `fd` open. False on failure.
+    bool watch(int fd, std::function<void()> ready);
+    void unwatch(int fd);
+    /// Runs `job` on the loop's thread. Any thread.
+    void post(std::function<void()> job);
+
+    // Timers, as LoopTimer uses them. Any thread.
+    unsigned addTimer(std::function<void()> job);
+    /// A removal on the loop's thread is certain to be the end of its calls.
+    void removeTimer(unsigned timer);
+    /// Needs no memory and no descriptor.
+    void setTimer(unsigned timer, std::chrono::milliseconds delay);
+
+    /// Runs until stop; to be called by the thread that owns the loop.
+    void run();
+    /// Any thread.
+    void stop();
 
 private:
     struct Watch {
@@ -63,6 +74,23 @@ private:
     std::map<unsigned, Timer> timers_ ZOR_GUARDED_BY(mutex_);
     unsigned lastTimer_ ZOR_GUARDED_BY(mutex_) = 0;
     std::vector<std::function<void()>> posted_ ZOR_GUARDED_BY(mutex_);
+};
+
+/// Has a job done on the loop's thread a while later. The loop outlives it, and does not run when it goes, unless it
+/// goes on the loop's thread.
+class LoopTimer {
+public:
+    LoopTimer(RunLoop& loop, std::function<void()> job) : loop_(loop), timer_(loop.addTimer(std::move(job))) {}
+    ~LoopTimer() { loop_.removeTimer(timer_); }
+    LoopTimer(const LoopTimer&) = delete;
+    LoopTimer& operator=(const LoopTimer&) = delete;
+
+    /// The job is due after the delay, once; at the earlier moment when it was due already. It cannot fail. Any thread.
+    void set(std::chrono::milliseconds delay) const { loop_.setTimer(timer_, delay); }
+
+private:
+    RunLoop& loop_;
+    const unsigned timer_;
 };
 
 // Signals as something to read: blocks them in the calling thread, so in every thread started after, and hands them out

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// The kernel's question for a process: whose containers, and which. Read from a packed buffer, each byte of which is
-// taken for hostile.
+// The kernel's question for a process, and its answer: whose containers, and which. The question is read from a packed
+// buffer, each byte of which is taken for hostile.
 #pragma once
 
 #include "base/Log.h"
@@ -8,6 +8,7 @@
 #include "upcall/packbuff/UpcallMessage.h"
 
 #include <cstdint>
+#include <map>
 #include <optional>
 #include <string>
 #include <vector>
@@ -35,5 +36,20 @@ struct ProcessContainersRequest {
 /// Reads from the cursor to the end item. Anything but success has been logged, and leaves `request` half filled.
 [[nodiscard]] upcall::ReturnCode readProcessContainersRequest(const Log& log, sb_packbuff& packbuff,
                                                               ProcessContainersRequest& request);
+
+/// Absolute paths, each there or not. Groups by identifier.
+struct ProcessContainers {
+    std::optional<std::string> homeDirectory;
+    std::optional<std::string> dataContainer;
+    std::optional<std::string> temporaryDirectory;
+    std::optional<std::map<std::string, std::string>> appGroups;
+    std::optional<std::string> systemContainer;
+    std::optional<std::map<std::string, std::string>> systemGroups;
+};
+
+/// Packs what there is in its fixed order, and the status behind it: whether `success` holds and all could be packed.
+/// An answer that does not fit is logged, and nothing but the status is packed after it.
+void packProcessContainersReply(const Log& log, sb_packbuff& packbuff, const ProcessContainers& containers,
+                                bool success);
 
 } // namespace zor
