@@ -62,7 +62,7 @@ void DaemonProcess::start(const std::vector<std::string>& moreArguments, const s
         ::setenv("ZORVANE_DURABILITY", "none", 1);
     else
         ::unsetenv("ZORVANE_DURABILITY");
-    daemon_.emplace(words, prepare);
+    daemon_.emplace(words, [&] { return (!prepare || prepare()) && fences_.enter(); });
     for (int tries = 0; tries < 3000 && running(); ++tries) {
         if (zorvane::Client::connect(connection()))
             return;

@@ -3,6 +3,7 @@
 #pragma once
 
 #include "process/Program.h"
+#include "process/UnitFences.h"
 #include "support/FileTree.h"
 #include "support/Files.h"
 #include "zorvane/Client.h"
@@ -24,7 +25,7 @@ public:
     explicit DaemonProcess(Syncs syncs = Syncs::off, const std::string& parent = "/dev/shm");
     ~DaemonProcess();
 
-    /// Starts the daemon and waits until clients can connect. `prepare` as Program's.
+    /// Starts the daemon behind the fences of its unit, and waits until clients can connect. `prepare` as Program's.
     void start(const std::vector<std::string>& moreArguments = {}, const std::function<bool()>& prepare = {});
     /// SIGKILL, and waits for the end.
     void kill();
@@ -49,11 +50,13 @@ public:
     [[nodiscard]] std::int64_t counter(const std::string& name) const;
     [[nodiscard]] std::size_t descriptors() const;
     [[nodiscard]] std::string log() const;
+    [[nodiscard]] const UnitFences& fences() const { return fences_; }
 
 private:
     int end(int signal);
     support::TemporaryDirectory directory_;
     const Syncs syncs_;
+    UnitFences fences_;
     std::optional<Program> daemon_;
     /// What earlier ones said.
     std::string said_;

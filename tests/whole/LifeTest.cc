@@ -21,11 +21,13 @@
 
 namespace zor::whole {
 
-// Goal: one daemon a root, an end on request, and start-up errors that say what to do.
+// Goal: one daemon a root, an end on request, start-up errors that say what to do; and the unit's fences are there.
 TEST(Life, SecondDaemonAndSigtermAndBrokenCommandLines) {
     DaemonProcess daemon;
     std::filesystem::create_directories(daemon.path("run/zorvane/zorvaned.status/occupied"));
     daemon.start();
+    const std::string fenced = "Seccomp:\t" + std::to_string(daemon.fences().hasFilter() ? 2 : 0);
+    EXPECT_NE(readFile("/proc/" + std::to_string(daemon.pid()) + "/status").find(fenced), std::string::npos);
     EXPECT_NE(daemon.log().find("No status socket: "), std::string::npos); // a help, not a service
     expectOutcome(runProgram({programPath("zorvaned"), "--root", daemon.root()}), 1, "zorvaned: ");
     EXPECT_EQ(daemon.terminate(), 0);
