@@ -25,6 +25,7 @@ struct Session {
     const char* kind = "user";
     const char* seat = "seat0";
     bool hint = false;
+    const char* state = "active";
 };
 
 /// A login service's answers and signals, on a bus of the test's own.
@@ -69,6 +70,11 @@ public:
     void hint(const std::string& name, bool locked) {
         sessions.at(path(name)).hint = locked;
         sd_bus_emit_properties_changed(bus_, path(name).c_str(), sessionInterface, "LockedHint", nullptr);
+    }
+    /// Its user has gone, and left a process behind. The service tells no more than that another screen is shown.
+    void close(const std::string& name) {
+        sessions.at(path(name)).state = "closing";
+        sd_bus_emit_properties_changed(bus_, path(name).c_str(), sessionInterface, "Active", nullptr);
     }
     /// Answers for as long as `isOver` says no. False: it never said yes.
     bool serve(const std::function<bool()>& isOver, std::chrono::milliseconds time = patience) const {
@@ -115,7 +121,10 @@ private:
             return sd_bus_message_append(reply, "s", session.kind);
         if (std::string_view(property) == "Seat")
             return sd_bus_message_append(reply, "(so)", session.seat, "/seat");
-        return sd_bus_message_append(reply, "b", session.hint ? 1 : 0);
+        if (std::string_view(property) == "State")
+            return sd_bus_message_append(reply, "s", session.state);
+        const bool active = session.state == std::string_view("active");
+        return sd_bus_message_append(reply, "b", std::string_view(property) == "Active" ? active : session.hint);
     }
     static const sd_bus_vtable managerTable[];
     static const sd_bus_vtable sessionTable[];
@@ -129,6 +138,8 @@ const sd_bus_vtable LoginService::sessionTable[] = {
     SD_BUS_VTABLE_START(0),
     SD_BUS_PROPERTY("Class", "s", get, 0, SD_BUS_VTABLE_PROPERTY_CONST),
     SD_BUS_PROPERTY("Seat", "(so)", get, 0, SD_BUS_VTABLE_PROPERTY_CONST),
+    SD_BUS_PROPERTY("State", "s", get, 0, 0),
+    SD_BUS_PROPERTY("Active", "b", get, 0, SD_BUS_VTABLE_PROPERTY_EMITS_CHANGE),
     SD_BUS_PROPERTY("LockedHint", "b", get, 0, SD_BUS_VTABLE_PROPERTY_EMITS_CHANGE),
     SD_BUS_SIGNAL("Lock", "", 0),
     SD_BUS_SIGNAL("Unlock", "", 0),
@@ -153,6 +164,9 @@ TEST(Lockd, TellsWhatTheLoginServiceSays) {
     const auto start = [&] {
         lockd.emplace(std::vector<std::string>{"/usr/bin/env", "DBUS_SYSTEM_BUS_ADDRESS=" + address,
                                                programPath("zorvane-lockd"), "--root", place.path()});
+    };
+    const auto staysLocked = [&] {
+        return !login.serve([&] { return support::readFile(state) != "1\n"; }, std::chrono::milliseconds(300));
     };
     login.own();
     // Each step ends in a state that is not the one before, so that it is waited for.
@@ -180,14 +194,17 @@ TEST(Lockd, TellsWhatTheLoginServiceSays) {
          },
          "0\n"},
         {"the open one ends, and the other is still locked", [&] { login.end("d"); }, "1\n"},
-        {"the service goes, which unlocks nothing, also where others say so; it comes back, and a session is open",
+        {"a user switch: another logs in", [&] { login.begin("e", {.kind = "user-light"}); }, "0\n"},
+        {"and out again, leaving a process", [&] { login.close("e"); }, "1\n"},
+        {"the service goes, which unlocks nothing, also where others say so; it comes back, having forgotten a signal",
          [&] {
              login.leave();
              hostile.signal("a", "Unlock", login.asker);
-             EXPECT_FALSE(
-                 login.serve([&] { return support::readFile(state) != "1\n"; }, std::chrono::milliseconds(300)));
+             EXPECT_TRUE(staysLocked());
              login.sessions.at(LoginService::path("a")).hint = false;
              login.own();
+             EXPECT_TRUE(staysLocked());
+             login.signal("a", "Unlock");
          },
          "0\n"},
         {"started anew after a kill",

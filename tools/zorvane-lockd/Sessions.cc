@@ -2,8 +2,11 @@
 #include "Sessions.h"
 
 #include <algorithm>
+#include <iterator>
 #include <memory>
 #include <optional>
+#include <string_view>
+#include <utility>
 
 namespace zorvanelockd {
 
@@ -28,10 +31,20 @@ Message property(sd_bus* bus, const std::string& path, const char* name, const c
     return Message(reply);
 }
 
+std::string textOf(sd_bus* bus, const std::string& path, const char* name) {
+    const Message reply = property(bus, path, name, "s");
+    const char* text = nullptr;
+    return reply && sd_bus_message_read(reply.get(), "s", &text) > 0 ? text : "";
+}
+
+/// A person's; newer services tell those apart that need less of the system, or begin before it is up.
 bool isUsers(sd_bus* bus, const std::string& path) {
-    const Message reply = property(bus, path, "Class", "s");
-    const char* kind = nullptr;
-    return reply && sd_bus_message_read(reply.get(), "s", &kind) > 0 && std::string_view(kind) == "user";
+    constexpr std::string_view kinds[] = {"user", "user-early", "user-light", "user-early-light"};
+    return std::ranges::find(kinds, textOf(bus, path, "Class")) != std::end(kinds);
+}
+
+bool isClosing(sd_bus* bus, const std::string& path) {
+    return textOf(bus, path, "State") == "closing";
 }
 
 bool hasSeat(sd_bus* bus, const std::string& path) {
@@ -91,25 +104,38 @@ void Sessions::begin() {
     // As long as nobody says what is so, what was told last holds: a service that has died unlocks nothing.
     if (!owner_.empty() && sd_bus_call_method(bus_, service, managerPath, managerInterface, "ListSessions", nullptr,
                                               &reply, nullptr) >= 0) {
-        locked_.clear();
+        const auto before = std::exchange(sessions_, {});
         const char* path = nullptr;
         (void)sd_bus_message_enter_container(reply, 'a', "(susso)");
-        while (sd_bus_message_read(reply, "(susso)", nullptr, nullptr, nullptr, nullptr, &path) > 0)
+        while (sd_bus_message_read(reply, "(susso)", nullptr, nullptr, nullptr, nullptr, &path) > 0) {
             add(path);
+            const auto now = sessions_.find(path);
+            const auto then = before.find(path);
+            if (now != sessions_.end() && now->second == Lock::open && then != before.end() &&
+                then->second == Lock::bySignal)
+                now->second = Lock::bySignal;
+        }
         tell();
     }
     sd_bus_message_unref(reply);
 }
 
 void Sessions::add(const std::string& path) {
-    if (!isUsers(bus_, path) || !hasSeat(bus_, path))
+    if (!isUsers(bus_, path) || !hasSeat(bus_, path) || isClosing(bus_, path))
         return;
     if (const auto hint = lockedHint(bus_, path))
-        locked_[path] = *hint;
+        sessions_[path] = *hint ? Lock::byHint : Lock::open;
+}
+
+void Sessions::forgetClosing() {
+    std::erase_if(sessions_,
+                  [&](const auto& session) { return session.second == Lock::open && isClosing(bus_, session.first); });
 }
 
 void Sessions::tell() {
-    changed_(!locked_.empty() && std::ranges::all_of(locked_, [](const auto& session) { return session.second; }));
+    forgetClosing();
+    changed_(!sessions_.empty() &&
+             std::ranges::all_of(sessions_, [](const auto& session) { return session.second != Lock::open; }));
 }
 
 bool Sessions::isServices(sd_bus_message* message) const {
@@ -129,26 +155,29 @@ int Sessions::added(sd_bus_message* message) {
 int Sessions::removed(sd_bus_message* message) {
     const char* path = nullptr;
     if (isServices(message) && sd_bus_message_read(message, "so", nullptr, &path) > 0) {
-        locked_.erase(path);
+        sessions_.erase(path);
         tell();
     }
     return 0;
 }
 
 int Sessions::lockSaid(sd_bus_message* message) {
-    const auto session = locked_.find(sd_bus_message_get_path(message));
-    if (isServices(message) && session != locked_.end()) {
-        session->second = std::string_view(sd_bus_message_get_member(message)) == "Lock";
+    const auto session = sessions_.find(sd_bus_message_get_path(message));
+    if (isServices(message) && session != sessions_.end()) {
+        session->second = std::string_view(sd_bus_message_get_member(message)) == "Lock" ? Lock::bySignal : Lock::open;
         tell();
     }
     return 0;
 }
 
 int Sessions::propertiesChanged(sd_bus_message* message) {
-    const std::string path = sd_bus_message_get_path(message);
-    const auto session = locked_.find(path);
-    if (!isServices(message) || session == locked_.end())
+    if (!isServices(message))
         return 0;
+    const auto session = sessions_.find(sd_bus_message_get_path(message));
+    if (session == sessions_.end()) {
+        tell(); // another's screen may be shown because a session is closing
+        return 0;
+    }
     // Other properties change often, and say nothing of a lock that was only signalled.
     const char* interface = nullptr;
     const char* name = nullptr;
@@ -159,7 +188,7 @@ int Sessions::propertiesChanged(sd_bus_message* message) {
         int hint = 0;
         if (sd_bus_message_read(message, "s", &name) > 0 && std::string_view(name) == "LockedHint" &&
             sd_bus_message_read(message, "v", "b", &hint) > 0)
-            session->second = hint != 0;
+            session->second = hint != 0 ? Lock::byHint : Lock::open;
         else
             (void)sd_bus_message_skip(message, "v");
         (void)sd_bus_message_exit_container(message);

@@ -1,12 +1,15 @@
 // SPDX-License-Identifier: Apache-2.0
 // The sessions at the device's seats, and whether all of them are locked, as the login service (logind) says.
 //
-// A session counts when it is a user's and has a seat: a remote one cannot be locked, and would hold the device open.
+// A session counts when it is a user's, has a seat and is not closing: a remote one cannot be locked, and nobody sits
+// at one whose user has logged out and left a process behind; either would hold the device open.
 // It is locked by the service's Lock signal and by its LockedHint, which the desktop sets, and unlocked by Unlock and
-// by the hint going; whichever is heard last counts. Anybody may send a signal to this connection, so one counts only
-// when it comes from the connection that owns the service's name. One thread: that of the bus.
+// by the hint going; whichever is heard last counts. The service remembers hints and forgets signals: a session that a
+// signal alone has locked stays so when the service is started anew. Anybody may send a signal to this connection, so
+// one counts only when it comes from the connection that owns the service's name. One thread: that of the bus.
 #pragma once
 
+#include <cstdint>
 #include <functional>
 #include <map>
 #include <string>
@@ -36,6 +39,8 @@ private:
     /// Asks the service for all that there is. One that does not answer leaves everything as it was.
     void begin();
     void add(const std::string& path);
+    /// Leaves out the open sessions that are closing: the service does not say when they begin to.
+    void forgetClosing();
     void tell();
     [[nodiscard]] bool isServices(sd_bus_message* message) const;
 
@@ -43,8 +48,9 @@ private:
     const Changed changed_;
     /// The connection that owns the service's name; empty while nobody does.
     std::string owner_;
-    /// Object path to whether the session is locked.
-    std::map<std::string, bool> locked_;
+    enum class Lock : std::uint8_t { open, bySignal, byHint };
+    /// By the sessions' object paths.
+    std::map<std::string, Lock> sessions_;
 };
 
 } // namespace zorvanelockd
