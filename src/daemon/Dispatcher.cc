@@ -61,9 +61,11 @@ bool identifiersAreUsable(CommandContext& context) {
 }
 
 /// For those who read what the request made the log say.
-void describeRequest(const platform::Peer& peer, const plist::Dictionary& request, const LogSubject::Take& take) {
+void describeRequest(const platform::Peer& peer, const platform::ServiceEvent& event, const LogSubject::Take& take) {
+    const plist::Dictionary& request = event.request;
     take("ZORVANE_PEER_PID", std::to_string(peer.pid()));
     take("ZORVANE_PEER_UID", std::to_string(peer.kernelUserId()));
+    take("ZORVANE_REQUEST", std::to_string(event.requestId));
     take("ZORVANE_COMMAND", std::to_string(request.unsignedInteger(ipc::keys::command).value_or(0)));
     if (const std::string* identifier = request.string(ipc::keys::identifier))
         take("ZORVANE_IDENTIFIER", *identifier);
@@ -80,7 +82,7 @@ void Dispatcher::ZORProcessIpsiEvent(platform::PeerConnection& connection, platf
         return;
     const Log::ClientScope provoked(connection.peer().kernelUserId());
     const std::function<void(const LogSubject::Take&)> describe = [&](const LogSubject::Take& take) {
-        describeRequest(connection.peer(), event.request, take);
+        describeRequest(connection.peer(), event, take);
     };
     const LogRequestScope asked(describe);
     if (serve(connection, event)) {

@@ -44,6 +44,8 @@ struct ServiceEvent {
     plist::Dictionary request;
     /// nullptr when the request cannot have a reply.
     std::shared_ptr<ReplyChannel> reply;
+    /// The number that the client gave the request, and finds in the reply; 0 unless kind is message.
+    std::uint64_t requestId = 0;
 };
 
 /// A peer connection as its handler sees it. Used only inside the handler's call.

@@ -186,7 +186,8 @@ bool ListenerConnection::serveFrame(const ipc::FrameHeader& header, std::span<co
     plist::Dictionary* request = value ? value->asMutableDictionary() : nullptr;
     if (!request)
         return false;
-    ServiceEvent event = {.kind = ServiceEvent::Kind::message, .request = std::move(*request), .reply = nullptr};
+    ServiceEvent event = {
+        .kind = ServiceEvent::Kind::message, .request = std::move(*request), .reply = nullptr, .requestId = header.id};
     if (header.expectsReply())
         event.reply = channelFor(header.id);
     core_.handler(*this, event);
@@ -304,7 +305,7 @@ void ListenerConnection::transmit(Channel& channel, plist::Data& frame) {
             dropLocked();
         return;
     case ListenerOutput::Result::tooMuch:
-        core_.incidents.happened(ListenerIncident::tooMuchOutput, static_cast<std::int64_t>(uid_));
+        core_.incidents.happened(ListenerIncident::tooMuchOutput, static_cast<std::int64_t>(uid_), channel.id);
         return dropLocked();
     case ListenerOutput::Result::broken:
         return dropLocked();
@@ -316,7 +317,7 @@ void ListenerConnection::unwritable(Channel& channel) {
     if (channel.sent || channel.life != life_ || !open_ || over_)
         return;
     channel.sent = true;
-    core_.incidents.happened(ListenerIncident::unwritableReply, static_cast<std::int64_t>(uid_));
+    core_.incidents.happened(ListenerIncident::unwritableReply, static_cast<std::int64_t>(uid_), channel.id);
     // A peer that waits for this reply has to learn that it does not come.
     dropLocked();
 }

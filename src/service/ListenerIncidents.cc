@@ -11,8 +11,9 @@ namespace zor::platform {
 
 namespace {
 
-std::string lineOf(ListenerIncident incident, std::int64_t about) {
+std::string lineOf(ListenerIncident incident, std::int64_t about, std::uint64_t requestId) {
     const auto number = static_cast<long long>(about);
+    const auto request = static_cast<unsigned long long>(requestId);
     switch (incident) {
     case ListenerIncident::tooManyConnections:
         return formatted("Connection refused, too many connections: uid %lld", number);
@@ -27,9 +28,9 @@ std::string lineOf(ListenerIncident incident, std::int64_t about) {
     case ListenerIncident::tooMuchInput:
         return formatted("Connection ended, too many bytes of unfinished requests: uid %lld", number);
     case ListenerIncident::tooMuchOutput:
-        return formatted("Connection ended, too many bytes of unread replies: uid %lld", number);
+        return formatted("Connection ended, too many bytes of unread replies: uid %lld, request %llu", number, request);
     case ListenerIncident::unwritableReply:
-        return formatted("A reply could not be written: uid %lld", number);
+        return formatted("A reply could not be written: uid %lld, request %llu", number, request);
     case ListenerIncident::unservable:
         return formatted("Connection ended, its request could not be served: pid %lld", number);
     }
@@ -43,7 +44,7 @@ std::int64_t secondsNow() {
 
 } // namespace
 
-void ListenerIncidents::happened(ListenerIncident incident, std::int64_t about) noexcept {
+void ListenerIncidents::happened(ListenerIncident incident, std::int64_t about, std::uint64_t request) noexcept {
     const auto index = static_cast<std::size_t>(incident);
     Kind& kind = kinds_[index];
     const std::uint64_t count = ++kind.count;
@@ -53,7 +54,7 @@ void ListenerIncidents::happened(ListenerIncident incident, std::int64_t about) 
         return;
     const std::uint64_t told = kind.countTold.exchange(count);
     try {
-        std::string line = lineOf(incident, about);
+        std::string line = lineOf(incident, about, request);
         if (count > told + 1)
             line += formatted(" (and %llu more before)", static_cast<unsigned long long>(count - told - 1));
         report_(line);

@@ -43,8 +43,9 @@ class ListenerIncidents {
 public:
     ListenerIncidents(ListenerReport report, std::chrono::seconds lineEvery)
         : report_(std::move(report)), lineEvery_(lineEvery) {}
-    /// `about` is the uid or the pid that the incident is about. Without memory the line is left out, not the count.
-    void happened(ListenerIncident incident, std::int64_t about) noexcept;
+    /// `about` is the uid or the pid that the incident is about, `request` the client's number of the request whose
+    /// reply is meant. Without memory the line is left out, not the count.
+    void happened(ListenerIncident incident, std::int64_t about, std::uint64_t request = 0) noexcept;
     [[nodiscard]] std::uint64_t count(ListenerIncident incident) const;
 
 private:

@@ -53,6 +53,10 @@ TEST_F(Dispatch, Refusals) {
         EXPECT_EQ(world.log.take(), (std::vector<LogLine>{{3, handler, "Dictionary does not have reply context"}}));
     }
     EXPECT_EQ(world.services().dispatcher().counts().served, 0U);
+    const Dictionary message{{"Command", 1}, {"Identifier", "a"}, {"ContainerClass", 2}, {"UserID", 501}};
+    handle({.kind = Kind::message, .request = message, .reply = std::make_shared<FakeReply>(), .requestId = 77});
+    EXPECT_EQ(world.log.request(), "ZORVANE_PEER_PID=4711 ZORVANE_PEER_UID=501 ZORVANE_REQUEST=77 ZORVANE_COMMAND=1 "
+                                   "ZORVANE_IDENTIFIER=a ZORVANE_CLASS=2 ZORVANE_USER=501 ");
 }
 
 // Goal: exactly the entitled are admitted and get one reply each. Method: all commands against all kinds of peer.

@@ -2,6 +2,7 @@
 // A log that keeps its lines, so that a test can ask for the exact level, function and words. Any thread.
 #pragma once
 
+#include "base/LogSubject.h"
 #include "base/Mutex.h"
 #include "platform/PlatformLog.h"
 
@@ -40,6 +41,12 @@ public:
     void write(int level, std::string_view function, std::string_view message) override {
         const platform::MutexLock held(mutex_);
         lines_.push_back({level, std::string(function), std::string(message)});
+        if (const auto* request = LogSubject::current().request) {
+            request_.clear();
+            (*request)([&](std::string_view name, std::string_view value) {
+                request_.append(name).append("=").append(value).append(" ");
+            });
+        }
     }
     void writeToSystemLog(int priority, std::string_view message) override { write(priority, "syslog", message); }
 
@@ -58,9 +65,16 @@ public:
         return messages;
     }
 
+    /// What a line told last of the request that it belongs to: "NAME=VALUE " for each field.
+    std::string request() {
+        const platform::MutexLock held(mutex_);
+        return request_;
+    }
+
 private:
     std::atomic<int> level_;
     platform::Mutex mutex_;
+    std::string request_ ZOR_GUARDED_BY(mutex_);
     std::vector<LogLine> lines_ ZOR_GUARDED_BY(mutex_);
 };
 
