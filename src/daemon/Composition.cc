@@ -23,22 +23,14 @@ void Composition::sayLeftOut(uid_t uid, std::uint64_t lines) const {
 }
 
 Composition::Late::Late(Composition& composition)
-    : operations({.log = composition.log_,
-                  .boundary = composition.boundary_,
-                  .locks = composition.locks_,
-                  .fileManager = composition.fileManager_,
-                  .durability = composition.durability_,
-                  .configuration = composition.configuration_,
-                  .cache = composition.cache_},
+    : operations({{composition.log_, composition.boundary_, composition.locks_, composition.cache_},
+                  composition.fileManager_,
+                  composition.durability_,
+                  composition.configuration_},
                  composition.platform_),
       sharedClientConnection(std::make_shared<ZORClientConnection>(operations, Caller::daemonItself())),
       dispatcher(composition.log_, composition.users_, operations),
-      upcallServer({.log = composition.log_,
-                    .boundary = composition.boundary_,
-                    .fileManager = composition.fileManager_,
-                    .configuration = composition.configuration_,
-                    .creation = operations.creation},
-                   composition.platform_.upcallPort) {}
+      upcallServer(composition.upcallNeeds(operations), composition.platform_.upcallPort) {}
 
 Composition::Late& Composition::late() {
     if (!late_)
@@ -59,11 +51,15 @@ UpcallServer& Composition::upcallServer() {
 }
 
 UpcallServer::Needs Composition::upcallNeeds() {
+    return upcallNeeds(store());
+}
+
+UpcallServer::Needs Composition::upcallNeeds(Operations& operations) {
     return {.log = log_,
             .boundary = boundary_,
             .fileManager = fileManager_,
             .configuration = configuration_,
-            .creation = store().creation};
+            .creation = operations.creation};
 }
 
 const std::shared_ptr<ZORClientConnection>& Composition::sharedClientConnection() {

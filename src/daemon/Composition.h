@@ -59,6 +59,7 @@ public:
 private:
     struct Late;
     Late& late();
+    [[nodiscard]] UpcallServer::Needs upcallNeeds(Operations& operations);
     void sayLeftOut(uid_t uid, std::uint64_t lines) const;
 
     platform::Platform platform_;

@@ -21,6 +21,7 @@
 #include "operations/LastingMoves.h"
 #include "operations/Listing.h"
 #include "operations/OrphanCleanUp.h"
+#include "operations/RecordNeeds.h"
 #include "operations/Replace.h"
 #include "operations/ReplaceRecovery.h"
 #include "operations/RetryTest.h"
@@ -44,14 +45,10 @@ namespace zor {
 
 struct Operations {
     /// The services that lie below all of them.
-    struct Store {
-        const Log& log;
-        ExceptionBoundary& boundary;
-        ZORLocks& locks;
+    struct Store : RecordNeeds {
         ZORFileManager& fileManager;
         const fs::Durability& durability;
         ZORGlobalConfiguration& configuration;
-        ZORContainerCache& cache;
     };
     /// Reads the entitlement file and the table of well-known containers.
     Operations(const Store& store, const platform::Platform& platform);

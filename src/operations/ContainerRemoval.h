@@ -9,14 +9,12 @@
 #include "base/ContainerClass.h"
 #include "base/FileURL.h"
 #include "base/ZORError.h"
-#include "base/ZORException.h"
-#include "base/ZORLocks.h"
 #include "ipc/UUID.h"
 #include "operations/DeathRow.h"
 #include "operations/LastingMoves.h"
+#include "operations/RecordNeeds.h"
 #include "operations/ReplaceRecovery.h"
 #include "operations/SandboxMappings.h"
-#include "store/ZORContainerCache.h"
 #include "store/ZORGlobalConfiguration.h"
 
 #include <cstdint>
@@ -37,13 +35,9 @@ struct ContainerToGo {
 
 class ContainerRemoval {
 public:
-    struct Needs {
-        const Log& log;
-        ExceptionBoundary& boundary;
-        ZORLocks& locks;
+    struct Needs : RecordNeeds {
         ZORFileManager& fileManager;
         ZORGlobalConfiguration& configuration;
-        ZORContainerCache& cache;
         const LastingMoves& moves;
         SandboxMappings& mappings;
         DeathRow& deathRow;

@@ -12,16 +12,14 @@
 
 #include "base/ContainerClass.h"
 #include "base/ZORError.h"
-#include "base/ZORException.h"
-#include "base/ZORLocks.h"
 #include "ipc/UUID.h"
 #include "operations/Caller.h"
 #include "operations/ContainerMaker.h"
 #include "operations/DeathRow.h"
 #include "operations/LastingMoves.h"
+#include "operations/RecordNeeds.h"
 #include "operations/ReplaceRecovery.h"
 #include "store/StoreLimits.h"
-#include "store/ZORContainerCache.h"
 #include "store/ZOREntitlementMapping.h"
 #include "store/ZORGlobalConfiguration.h"
 
@@ -50,12 +48,8 @@ struct CreateOrLookupOptions {
 
 class Creation {
 public:
-    struct Needs {
-        const Log& log;
-        ExceptionBoundary& boundary;
-        ZORLocks& locks;
+    struct Needs : RecordNeeds {
         ZORGlobalConfiguration& configuration;
-        ZORContainerCache& cache;
         ZOREntitlementMapping& entitlements;
         const StoreLimits& limits;
         const LastingMoves& moves;

@@ -10,13 +10,12 @@
 
 #include "base/ContainerClass.h"
 #include "base/ZORError.h"
-#include "base/ZORException.h"
-#include "base/ZORLocks.h"
 #include "ipc/UUID.h"
 #include "operations/Caller.h"
 #include "operations/ContainerRemoval.h"
 #include "operations/Creation.h"
 #include "operations/EntitlementChange.h"
+#include "operations/RecordNeeds.h"
 
 #include <cstdint>
 #include <expected>
@@ -41,11 +40,7 @@ struct DeletionBatch {
 
 class Deletion {
 public:
-    struct Needs {
-        const Log& log;
-        ExceptionBoundary& boundary;
-        ZORLocks& locks;
-        ZORContainerCache& cache;
+    struct Needs : RecordNeeds {
         Creation& creation;
         ContainerRemoval& removal;
         EntitlementChange& entitlementChange;

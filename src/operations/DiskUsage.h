@@ -13,13 +13,11 @@
 
 #include "base/ErrorCode.h"
 #include "base/ZORError.h"
-#include "base/ZORException.h"
-#include "base/ZORLocks.h"
 #include "fs/ZORFileManager.h"
 #include "operations/Caller.h"
 #include "operations/InfoValues.h"
 #include "operations/KnownContainer.h"
-#include "store/ZORContainerCache.h"
+#include "operations/RecordNeeds.h"
 
 #include <chrono>
 #include <cstdint>
@@ -35,12 +33,8 @@ struct DiskUsageAnswer {
 
 class DiskUsage {
 public:
-    struct Needs {
-        const Log& log;
-        ExceptionBoundary& boundary;
-        ZORLocks& locks;
+    struct Needs : RecordNeeds {
         ZORFileManager& fileManager;
-        ZORContainerCache& cache;
         InfoValues& infoValues;
     };
     explicit DiskUsage(const Needs& needs) : needs_(needs) {}

@@ -16,12 +16,10 @@
 #include "base/FileURL.h"
 #include "base/Mutex.h"
 #include "base/ZORError.h"
-#include "base/ZORException.h"
-#include "base/ZORLocks.h"
 #include "operations/ContainerRemoval.h"
+#include "operations/RecordNeeds.h"
 #include "operations/ZORGroupManager.h"
 #include "plist/Value.h"
-#include "store/ZORContainerCache.h"
 #include "store/ZOREntitlementMapping.h"
 #include "store/ZORGlobalConfiguration.h"
 
@@ -33,12 +31,8 @@ namespace zor {
 
 class EntitlementChange {
 public:
-    struct Needs {
-        const Log& log;
-        ExceptionBoundary& boundary;
-        ZORLocks& locks;
+    struct Needs : RecordNeeds {
         const ZORGlobalConfiguration& configuration;
-        ZORContainerCache& cache;
         ZOREntitlementMapping& entitlements;
         ContainerRemoval& removal;
         ZORGroupManager& groups;

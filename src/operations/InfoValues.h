@@ -6,14 +6,12 @@
 #pragma once
 
 #include "base/ZORError.h"
-#include "base/ZORException.h"
-#include "base/ZORLocks.h"
 #include "fs/ZORFileManager.h"
 #include "operations/Caller.h"
 #include "operations/KnownContainer.h"
+#include "operations/RecordNeeds.h"
 #include "plist/Value.h"
 #include "store/StoreLimits.h"
-#include "store/ZORContainerCache.h"
 #include "store/ZORMetadata.h"
 
 #include <atomic>
@@ -29,12 +27,8 @@ struct ContainerMetadata {
 
 class InfoValues {
 public:
-    struct Needs {
-        const Log& log;
-        ExceptionBoundary& boundary;
-        ZORLocks& locks;
+    struct Needs : RecordNeeds {
         ZORFileManager& fileManager;
-        ZORContainerCache& cache;
         const StoreLimits& limits;
     };
     explicit InfoValues(const Needs& needs) : needs_(needs) {}

@@ -4,11 +4,9 @@
 
 #include "base/ContainerClass.h"
 #include "base/ZORError.h"
-#include "base/ZORException.h"
-#include "base/ZORLocks.h"
 #include "ipc/UUID.h"
+#include "operations/RecordNeeds.h"
 #include "store/StoreLimits.h"
-#include "store/ZORContainerCache.h"
 
 #include <cstdint>
 #include <optional>
@@ -30,11 +28,7 @@ struct ListedPage {
 
 class Listing {
 public:
-    struct Needs {
-        const Log& log;
-        ExceptionBoundary& boundary;
-        ZORLocks& locks;
-        ZORContainerCache& cache;
+    struct Needs : RecordNeeds {
         const StoreLimits& limits;
     };
     explicit Listing(const Needs& needs) : needs_(needs) {}

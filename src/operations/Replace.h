@@ -31,15 +31,13 @@
 
 #include "base/ContainerClass.h"
 #include "base/ZORError.h"
-#include "base/ZORException.h"
-#include "base/ZORLocks.h"
 #include "ipc/UUID.h"
 #include "operations/DeathRow.h"
 #include "operations/LastingMoves.h"
+#include "operations/RecordNeeds.h"
 #include "operations/ReplaceRecovery.h"
 #include "operations/SandboxMappings.h"
 #include "os/FileDescriptor.h"
-#include "store/ZORContainerCache.h"
 #include "store/ZORGlobalConfiguration.h"
 #include "store/ZORWhitelist.h"
 
@@ -65,13 +63,9 @@ struct ReplaceRequest {
 
 class Replace {
 public:
-    struct Needs {
-        const Log& log;
-        ExceptionBoundary& boundary;
-        ZORLocks& locks;
+    struct Needs : RecordNeeds {
         ZORFileManager& fileManager;
         ZORGlobalConfiguration& configuration;
-        ZORContainerCache& cache;
         const ZORWhitelist& whitelist;
         const LastingMoves& moves;
         SandboxMappings& mappings;

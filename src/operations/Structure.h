@@ -13,14 +13,12 @@
 
 #include "base/FileURL.h"
 #include "base/ZORError.h"
-#include "base/ZORException.h"
-#include "base/ZORLocks.h"
 #include "fs/ZORFileManager.h"
 #include "operations/KnownContainer.h"
 #include "operations/LastingMoves.h"
+#include "operations/RecordNeeds.h"
 #include "operations/ReplaceRecovery.h"
 #include "operations/SandboxMappings.h"
-#include "store/ZORContainerCache.h"
 
 #include <vector>
 
@@ -30,12 +28,8 @@ struct ContainerLayout;
 
 class Structure {
 public:
-    struct Needs {
-        const Log& log;
-        ExceptionBoundary& boundary;
-        ZORLocks& locks;
+    struct Needs : RecordNeeds {
         ZORFileManager& fileManager;
-        ZORContainerCache& cache;
         const LastingMoves& moves;
         SandboxMappings& mappings;
         ReplaceRecovery& recovery;

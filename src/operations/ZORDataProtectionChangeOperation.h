@@ -16,12 +16,10 @@
 #pragma once
 
 #include "base/ZORError.h"
-#include "base/ZORException.h"
-#include "base/ZORLocks.h"
 #include "fs/TreeWalker.h"
 #include "fs/ZORFileManager.h"
 #include "operations/Background.h"
-#include "store/ZORContainerCache.h"
+#include "operations/RecordNeeds.h"
 #include "store/ZORMetadata.h"
 
 #include <cstdint>
@@ -53,12 +51,8 @@ struct DirectoryIdentity {
 
 class ZORDataProtectionChangeOperation : public std::enable_shared_from_this<ZORDataProtectionChangeOperation> {
 public:
-    struct Needs {
-        const Log& log;
-        ExceptionBoundary& boundary;
-        ZORLocks& locks;
+    struct Needs : RecordNeeds {
         ZORFileManager& fileManager;
-        ZORContainerCache& cache;
         /// The lock-state queue.
         Background retries;
     };

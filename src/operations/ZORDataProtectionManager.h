@@ -10,14 +10,12 @@
 #include "base/ErrorCode.h"
 #include "base/Mutex.h"
 #include "base/ZORError.h"
-#include "base/ZORException.h"
-#include "base/ZORLocks.h"
 #include "ipc/UUID.h"
 #include "operations/InfoValues.h"
+#include "operations/RecordNeeds.h"
 #include "operations/ZORDataProtectionChangeOperation.h"
 #include "platform/Device.h"
 #include "store/StoreLimits.h"
-#include "store/ZORContainerCache.h"
 
 #include <cstdint>
 #include <functional>
@@ -31,11 +29,7 @@ namespace zor {
 
 class ZORDataProtectionManager {
 public:
-    struct Needs {
-        const Log& log;
-        ExceptionBoundary& boundary;
-        ZORLocks& locks;
-        ZORContainerCache& cache;
+    struct Needs : RecordNeeds {
         platform::TerminationAssertionService& assertions;
         const StoreLimits& limits;
         InfoValues& infoValues;

@@ -8,14 +8,12 @@
 
 #include "base/ContainerClass.h"
 #include "base/ZORError.h"
-#include "base/ZORException.h"
-#include "base/ZORLocks.h"
 #include "operations/Caller.h"
 #include "operations/ContainerRemoval.h"
 #include "operations/Creation.h"
+#include "operations/RecordNeeds.h"
 #include "store/EntitlementFile.h"
 #include "store/SetupReport.h"
-#include "store/ZORContainerCache.h"
 #include "store/ZOREntitlementMapping.h"
 #include "store/ZORGlobalConfiguration.h"
 
@@ -30,12 +28,8 @@ namespace zor {
 
 class ZORGroupManager {
 public:
-    struct Needs {
-        const Log& log;
-        ExceptionBoundary& boundary;
-        ZORLocks& locks;
+    struct Needs : RecordNeeds {
         ZORGlobalConfiguration& configuration;
-        ZORContainerCache& cache;
         ZOREntitlementMapping& entitlements;
         Creation& creation;
         ContainerRemoval& removal;

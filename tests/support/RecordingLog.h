@@ -2,7 +2,7 @@
 // A log that keeps its lines, so that a test can ask for the exact level, function and words. Any thread.
 #pragma once
 
-#include "base/LogSubject.h"
+#include "base/Log.h"
 #include "base/Mutex.h"
 #include "platform/PlatformLog.h"
 
