@@ -5,8 +5,10 @@
 #include "identity/UserConfiguration.h"
 #include "os/Names.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
+#include <span>
 #include <unistd.h>
 
 namespace zor::platform {
@@ -21,6 +23,16 @@ constexpr const char* lockStateLabel = "com.veltra.zorvaned.lockstate";
 
 std::unexpected<std::string> cannot(const std::string& what, int error) {
     return std::unexpected(what + ": " + ::strerrordesc_np(error));
+}
+
+/// Writes the file that tells clients whose containers are whose, unless an earlier start has. 0 or a negative errno.
+int tellUsers(Disk& disk, int runtimeDirectory, const ipc::UserNumbers& numbers) {
+    const std::string text = ipc::textOf(numbers);
+    const std::span bytes(reinterpret_cast<const std::uint8_t*>(text.data()), text.size());
+    const auto there = fs::readOwnedFile(disk, runtimeDirectory, names::usersFile, bytes.size());
+    if (there && std::ranges::equal(*there, bytes))
+        return 0;
+    return fs::replaceFileDurably(disk, runtimeDirectory, names::usersFile, usersFileMode, bytes);
 }
 
 } // namespace
@@ -47,10 +59,7 @@ std::expected<std::unique_ptr<LinuxPlatform>, std::string> LinuxPlatform::open(O
     auto users = configuredUsers(*root, LinuxPasswordDatabase(*root));
     if (!users)
         return std::unexpected(std::move(users).error());
-    const std::string numbers = ipc::textOf(users->numbers);
-    if (const int failed =
-            fs::replaceFileDurably(disk, root->runtimeDirectory(), names::usersFile, usersFileMode,
-                                   {reinterpret_cast<const std::uint8_t*>(numbers.data()), numbers.size()}))
+    if (const int failed = tellUsers(disk, root->runtimeDirectory(), users->numbers))
         return cannot("cannot write " + runtime + "/" + names::usersFile, -failed);
     return std::unique_ptr<LinuxPlatform>(
         new LinuxPlatform(std::move(*root), std::move(*lock), std::move(*users), std::move(options)));

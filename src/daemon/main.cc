@@ -5,6 +5,7 @@
 #include "daemon/LinuxPlatform.h"
 #include "daemon/Options.h"
 #include "daemon/Status.h"
+#include "identity/AddressSpace.h"
 #include "os/FileDescriptor.h"
 #include "os/Names.h"
 #include "os/RunLoop.h"
@@ -157,6 +158,8 @@ int main(int argumentCount, char** arguments) {
         std::fputs("zorvaned: standard input, output or error is closed, and there is no /dev/null for it\n", stderr);
         return 1;
     }
+    // The child works while this process does, and is gone before the first client is served.
+    platform::AddressSpace::beginTrial();
 
     const std::size_t descriptorsMax = raiseDescriptorLimit();
     const auto limits = platform::ListenerLimits::forDescriptors(descriptorsMax);
@@ -195,6 +198,7 @@ int main(int argumentCount, char** arguments) {
                                 .containersPerUser = options->containersPerUser,
                                 .beforeClients =
                                     [&] {
+                                        (void)platform::AddressSpace::isTold();
                                         sayIfConnectionsAreFew(limits, descriptorsMax, composition.log());
                                         for (const std::string& doubt : (*platform)->users().doubts)
                                             composition.log().writeText(logLevelError, "main", doubt);
@@ -205,7 +209,11 @@ int main(int argumentCount, char** arguments) {
                                         (void)notify.send("READY=1");
                                         watchdog.start(platform::NotifySocket::watchdogOfEnvironment());
                                     },
-                                .settingUp = [&] { (void)notify.send(setupGoesOn); },
+                                .settingUp =
+                                    [&] {
+                                        (void)platform::AddressSpace::isTold();
+                                        (void)notify.send(setupGoesOn);
+                                    },
                                 .stopWanted = [&] { return stop.isWanted(); }});
     const int exitStatus = daemon.run();
     (void)notify.send("STOPPING=1\nSTATUS=Ending what is under way");

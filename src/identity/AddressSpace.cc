@@ -58,39 +58,74 @@ bool AddressSpace::lives() const {
     return pageMap_.valid() && ::pread(pageMap_.get(), &byte, sizeof byte, 0) < 0 && errno == EINVAL;
 }
 
+/// A child that lives in an address space of its own until it is told to execute a program, which it then does while
+/// this process goes on.
+class AddressSpace::Trial {
+public:
+    Trial();
+    ~Trial();
+    Trial(const Trial&) = delete;
+    Trial& operator=(const Trial&) = delete;
+    /// Waits for the child's end.
+    [[nodiscard]] bool outcome() const { return livedBefore_ && ends(end_.get()) && !space_.lives(); }
+
+private:
+    pid_t child_ = -1;
+    FileDescriptor end_;
+    AddressSpace space_;
+    bool livedBefore_ = false;
+};
+
+AddressSpace::Trial::Trial() {
+    const FileDescriptor self(::open("/proc/self", O_PATH | O_DIRECTORY | O_CLOEXEC));
+    int begin[2] = {};
+    int end[2] = {};
+    if (!self.valid() || !opened(self.get()).lives() || ::pipe2(begin, O_CLOEXEC) != 0)
+        return;
+    const FileDescriptor beginReading(begin[0]);
+    FileDescriptor beginWriting(begin[1]);
+    if (::pipe2(end, O_CLOEXEC) != 0)
+        return;
+    end_.reset(end[0]);
+    const FileDescriptor endWriting(end[1]);
+    // Not vfork: its child would share the address space. The child calls nothing that needs a lock of this process.
+    child_ = ::fork();
+    if (child_ < 0)
+        return;
+    if (child_ == 0) {
+        char byte = 0;
+        beginWriting.reset();
+        (void)!::read(beginReading.get(), &byte, sizeof byte);
+        execute(endWriting.get());
+    }
+    const std::string path = "/proc/" + std::to_string(child_);
+    const FileDescriptor process(::open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    space_ = opened(process.get());
+    livedBefore_ = space_.lives();
+}
+
+AddressSpace::Trial::~Trial() {
+    if (child_ <= 0)
+        return;
+    ::kill(child_, SIGKILL);
+    ::waitpid(child_, nullptr, 0);
+}
+
+std::unique_ptr<AddressSpace::Trial>& AddressSpace::trial() {
+    static std::unique_ptr<Trial> begun;
+    return begun;
+}
+
+void AddressSpace::beginTrial() {
+    trial() = std::make_unique<Trial>();
+}
+
 bool AddressSpace::isTold() {
     static const bool told = [] {
-        const FileDescriptor self(::open("/proc/self", O_PATH | O_DIRECTORY | O_CLOEXEC));
-        int begin[2] = {};
-        int end[2] = {};
-        if (!self.valid() || !opened(self.get()).lives() || ::pipe2(begin, O_CLOEXEC) != 0)
-            return false;
-        const FileDescriptor beginReading(begin[0]);
-        FileDescriptor beginWriting(begin[1]);
-        if (::pipe2(end, O_CLOEXEC) != 0)
-            return false;
-        const FileDescriptor endReading(end[0]);
-        FileDescriptor endWriting(end[1]);
-        // Not vfork: its child would share the address space.
-        const pid_t child = ::fork();
-        if (child < 0)
-            return false;
-        if (child == 0) {
-            char byte = 0;
-            beginWriting.reset();
-            (void)!::read(beginReading.get(), &byte, sizeof byte);
-            execute(endWriting.get());
-        }
-        const std::string path = "/proc/" + std::to_string(child);
-        const FileDescriptor process(::open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-        const AddressSpace space = opened(process.get());
-        const bool livedBefore = space.lives();
-        endWriting.reset();
-        beginWriting.reset();
-        const bool left = ends(endReading.get()) && !space.lives();
-        ::kill(child, SIGKILL);
-        ::waitpid(child, nullptr, 0);
-        return livedBefore && left;
+        if (!trial())
+            beginTrial();
+        const std::unique_ptr<Trial> begun = std::move(trial());
+        return begun->outcome();
     }();
     return told;
 }

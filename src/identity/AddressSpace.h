@@ -13,6 +13,8 @@
 
 #include "os/FileDescriptor.h"
 
+#include <memory>
+
 namespace zor::platform {
 
 class AddressSpace {
@@ -23,12 +25,17 @@ public:
     [[nodiscard]] static AddressSpace of(int process);
     /// Whether it lives still, as far as this can tell. False where the kernel gives another answer than expected.
     [[nodiscard]] bool lives() const;
-    /// Whether the kernel tells it at all: tried, once, on this process and on a child that executes a program. To be
-    /// called before there are other threads.
+    /// Whether the kernel tells it at all: tried, once, on this process and on a child that executes a program. Waits
+    /// for the child, a second at most, and leaves none.
     [[nodiscard]] static bool isTold();
+    /// Starts the child, for who has other work until isTold. Called once, before there are other threads; the child is
+    /// there until isTold.
+    static void beginTrial();
 
 private:
+    class Trial;
     [[nodiscard]] static AddressSpace opened(int process);
+    [[nodiscard]] static std::unique_ptr<Trial>& trial();
 
     FileDescriptor pageMap_;
 };

@@ -4,11 +4,14 @@
 #include "os/Names.h"
 #include "os/Openat2.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
+#include <ctime>
 #include <fcntl.h>
-#include <memory>
-#include <vector>
+#include <pwd.h>
+#include <sys/stat.h>
+#include <utility>
 
 namespace zor::platform {
 
@@ -16,10 +19,46 @@ namespace {
 
 constexpr std::size_t entryBytesFirst = 4096;
 constexpr std::size_t entryBytesMax = 64 * 1024;
+/// A thousand accounts. A longer file is read each time, for its entries would be most of an idle daemon's memory.
+constexpr off_t contentBytesMax = 64 * 1024;
+/// A change within one tick of the clock leaves the stamp as it is, so a younger content is not kept. File systems that
+/// count whole seconds have longer ticks.
+constexpr std::int64_t tickNanosecondsMax = 20'000'000;
+constexpr std::int64_t nanosecondsPerSecond = 1'000'000'000;
 
 struct FileCloser {
     void operator()(std::FILE* file) const { std::fclose(file); }
 };
+
+std::int64_t nanoseconds(const timespec& time) {
+    return std::int64_t{time.tv_sec} * nanosecondsPerSecond + time.tv_nsec;
+}
+
+bool isSettled(std::int64_t changedNanoseconds) {
+    timespec now{};
+    ::clock_gettime(CLOCK_REALTIME_COARSE, &now);
+    const bool wholeSeconds = changedNanoseconds % nanosecondsPerSecond == 0;
+    return nanoseconds(now) - changedNanoseconds > (wholeSeconds ? 2 * nanosecondsPerSecond : tickNanosecondsMax);
+}
+
+PasswordEntry named(const passwd& found) {
+    return {.name = found.pw_name, .uid = found.pw_uid, .homeDirectory = found.pw_dir ? found.pw_dir : ""};
+}
+
+/// Hands over each entry until `visit` wants no more. ENOENT when that never came, any other errno when the file cannot
+/// be read.
+int visitEntries(std::FILE* file, const std::function<bool(PasswordEntry)>& visit) {
+    const auto buffer = std::make_unique_for_overwrite<char[]>(entryBytesMax);
+    passwd entry{};
+    passwd* found = nullptr;
+    int error = 0;
+    while ((error = ::fgetpwent_r(file, &entry, buffer.get(), entryBytesMax, &found)) == 0) {
+        if (!visit(named(*found)))
+            return 0;
+    }
+    // A line longer than the buffer ends the search: no entry is that long, and behind it nothing can be trusted.
+    return error == ERANGE ? ENOENT : error;
+}
 
 /// Calls a getpw*_r function with a buffer that grows until the entry fits, and hands the entry on.
 template <typename Lookup, typename Convert>
@@ -30,7 +69,7 @@ std::expected<PasswordEntry, int> lookUp(Lookup lookup, Convert convert) {
         passwd* found = nullptr;
         const int error = lookup(&entry, buffer.data(), buffer.size(), &found);
         if (error == 0)
-            return found ? convert(*found) : std::unexpected(ENOENT);
+            return found ? convert(named(*found)) : std::unexpected(ENOENT);
         if (error == EINTR)
             continue;
         if (error != ERANGE || buffer.size() >= entryBytesMax)
@@ -43,44 +82,69 @@ std::expected<PasswordEntry, int> lookUp(Lookup lookup, Convert convert) {
 
 std::expected<PasswordEntry, int> LinuxPasswordDatabase::entryForUserId(std::uint32_t uid) const {
     if (!root_.isDeviceRoot())
-        return findInFile([uid](const passwd& entry) { return entry.pw_uid == uid; });
+        return findInFile([uid](const PasswordEntry& entry) { return entry.uid == uid; });
     return lookUp([uid](auto... rest) { return ::getpwuid_r(uid, rest...); },
-                  [this](const passwd& found) { return entryOf(found); });
+                  [this](PasswordEntry found) { return entryOf(std::move(found)); });
 }
 
 std::expected<PasswordEntry, int> LinuxPasswordDatabase::entryForName(std::string_view name) const {
     if (!root_.isDeviceRoot())
-        return findInFile([name](const passwd& entry) { return name == entry.pw_name; });
+        return findInFile([name](const PasswordEntry& entry) { return entry.name == name; });
     return lookUp([text = std::string(name)](auto... rest) { return ::getpwnam_r(text.c_str(), rest...); },
-                  [this](const passwd& found) { return entryOf(found); });
+                  [this](PasswordEntry found) { return entryOf(std::move(found)); });
 }
 
-std::expected<PasswordEntry, int>
-LinuxPasswordDatabase::findInFile(const std::function<bool(const passwd&)>& matches) const {
-    auto opened = openInRoot(root_.descriptor(), names::passwordFile, O_RDONLY | O_NONBLOCK);
-    if (!opened)
-        return std::unexpected(opened.error());
-    const std::unique_ptr<std::FILE, FileCloser> file(::fdopen(opened->get(), "re"));
-    if (!file)
+std::expected<LinuxPasswordDatabase::Stamp, int> LinuxPasswordDatabase::stampOf(int file) {
+    struct stat status{};
+    if (::fstat(file, &status) != 0)
         return std::unexpected(errno);
-    (void)opened->release();
-    std::vector<char> buffer(entryBytesMax);
-    passwd entry{};
-    passwd* found = nullptr;
-    int error;
-    while ((error = ::fgetpwent_r(file.get(), &entry, buffer.data(), buffer.size(), &found)) == 0) {
-        if (matches(*found))
-            return entryOf(*found);
-    }
-    // A line longer than the buffer ends the search: no entry is that long, and behind it nothing can be trusted.
-    return std::unexpected(error == ERANGE ? ENOENT : error);
+    return Stamp{.device = status.st_dev,
+                 .inode = status.st_ino,
+                 .bytes = status.st_size,
+                 .modifiedNanoseconds = nanoseconds(status.st_mtim),
+                 .changedNanoseconds = nanoseconds(status.st_ctim)};
 }
 
-std::expected<PasswordEntry, int> LinuxPasswordDatabase::entryOf(const passwd& found) const {
-    const std::string_view home = found.pw_dir ? found.pw_dir : "";
-    if (!home.starts_with('/'))
+std::expected<PasswordEntry, int> LinuxPasswordDatabase::findInFile(const Matches& matches) const {
+    auto opened = openInRoot(root_.descriptor(), names::passwordFile, O_RDONLY | O_NONBLOCK);
+    const auto stamp = opened ? stampOf(opened->get()) : std::unexpected(opened.error());
+    if (!stamp)
+        return std::unexpected(stamp.error());
+    std::shared_ptr<const Content> content;
+    {
+        const MutexLock held(mutex_);
+        content = content_;
+    }
+    int end = ENOENT;
+    if (!content || content->stamp != *stamp) {
+        const bool settled = isSettled(stamp->changedNanoseconds);
+        const std::unique_ptr<std::FILE, FileCloser> file(::fdopen(opened->get(), "re"));
+        if (!file)
+            return std::unexpected(errno);
+        const int descriptor = opened->release();
+        auto read = std::make_shared<Content>(Content{.stamp = *stamp, .entries = {}});
+        const bool keeps = stamp->bytes <= contentBytesMax;
+        end = visitEntries(file.get(), [&](PasswordEntry entry) {
+            if (!keeps && !matches(entry))
+                return true;
+            read->entries.push_back(std::move(entry));
+            return keeps;
+        });
+        if (keeps && settled && end == ENOENT && stampOf(descriptor) == *stamp) {
+            const MutexLock held(mutex_);
+            content_ = read;
+        }
+        content = std::move(read);
+    }
+    const auto found = std::ranges::find_if(content->entries, matches);
+    return found == content->entries.end() ? std::unexpected(end) : entryOf(*found);
+}
+
+std::expected<PasswordEntry, int> LinuxPasswordDatabase::entryOf(PasswordEntry named) const {
+    if (!named.homeDirectory.starts_with('/'))
         return std::unexpected(ENOENT);
-    return PasswordEntry{.name = found.pw_name, .uid = found.pw_uid, .homeDirectory = root_.path(home)};
+    named.homeDirectory = root_.path(named.homeDirectory);
+    return named;
 }
 
 } // namespace zor::platform

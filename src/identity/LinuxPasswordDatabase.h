@@ -1,13 +1,19 @@
 // SPDX-License-Identifier: Apache-2.0
-// The users of the device: the system's own database on "/", DIR/etc/passwd on any other root. Read anew each time; any
-// thread.
+// The users of the device: the system's own database on "/", DIR/etc/passwd on any other root. Any thread.
+//
+// The system's database is asked each time. The file is opened each time, and read again when its stamp is another one;
+// a start asks for dozens of users, most of whom have no account.
 #pragma once
 
+#include "base/Mutex.h"
 #include "os/SystemRoot.h"
 #include "platform/Device.h"
 
+#include <cstdint>
 #include <functional>
-#include <pwd.h>
+#include <memory>
+#include <sys/types.h>
+#include <vector>
 
 namespace zor::platform {
 
@@ -18,10 +24,30 @@ public:
     [[nodiscard]] std::expected<PasswordEntry, int> entryForName(std::string_view name) const override;
 
 private:
-    [[nodiscard]] std::expected<PasswordEntry, int> findInFile(const std::function<bool(const passwd&)>& matches) const;
-    [[nodiscard]] std::expected<PasswordEntry, int> entryOf(const passwd& found) const;
+    /// Tells one content of the file from another.
+    struct Stamp {
+        dev_t device = 0;
+        ino_t inode = 0;
+        off_t bytes = 0;
+        std::int64_t modifiedNanoseconds = 0;
+        std::int64_t changedNanoseconds = 0;
+        bool operator==(const Stamp&) const = default;
+    };
+    /// The file as it was read; a home is as the file names it.
+    struct Content {
+        Stamp stamp;
+        std::vector<PasswordEntry> entries;
+    };
+    using Matches = std::function<bool(const PasswordEntry&)>;
+
+    [[nodiscard]] static std::expected<Stamp, int> stampOf(int file);
+    [[nodiscard]] std::expected<PasswordEntry, int> findInFile(const Matches& matches) const ZOR_EXCLUDES(mutex_);
+    /// `named`, with its home below the root; ENOENT when that is no absolute path.
+    [[nodiscard]] std::expected<PasswordEntry, int> entryOf(PasswordEntry named) const;
 
     const SystemRoot& root_;
+    mutable Mutex mutex_;
+    mutable std::shared_ptr<const Content> content_ ZOR_GUARDED_BY(mutex_);
 };
 
 } // namespace zor::platform

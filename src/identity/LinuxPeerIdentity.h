@@ -22,9 +22,7 @@ public:
     /// `daemonUserId` is the uid that this process runs under. A daemon that is not root reports its own uid and root's
     /// as 0: on its root it is the owner.
     LinuxPeerIdentity(IdentityRegistry& registry, uid_t daemonUserId)
-        : registry_(registry), daemonUserId_(daemonUserId) {
-        (void)AddressSpace::isTold();
-    }
+        : registry_(registry), daemonUserId_(daemonUserId) {}
 
     /// Whether /proc is of this process's own pid namespace: in another's, numbers are other processes'. A daemon for
     /// which it is not cannot tell its peers apart.

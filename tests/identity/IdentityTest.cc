@@ -427,6 +427,16 @@ TEST(PasswordDatabase, ReadsTheRootsOwnFile) {
     EXPECT_EQ(database.entryForName("other")->homeDirectory, test.path("elsewhere"));
     for (const char* name : {"homeless", "relative", "absent", ""})
         EXPECT_FALSE(database.entryForName(name)) << name;
+    // A content that has been kept does not outlive its file, even when all but the time of change stays as it was.
+    const std::string file = test.path(names::passwordFile);
+    const timespec longAgo[2] = {{.tv_sec = 1, .tv_nsec = 1}, {.tv_sec = 1, .tv_nsec = 1}};
+    for (const char* home : {"a", "b", "c"}) {
+        test.write(names::passwordFile, std::string("mobile:x:501:501::/") + home + ":/bin/sh\n");
+        ASSERT_EQ(::utimensat(AT_FDCWD, file.c_str(), longAgo, 0), 0);
+        EXPECT_EQ(database.entryForUserId(501)->homeDirectory, test.path(home)) << "just written";
+        ::usleep(30'000);
+        EXPECT_EQ(database.entryForUserId(501)->homeDirectory, test.path(home));
+    }
     // On the device itself the whole database of the system counts.
     EXPECT_TRUE(LinuxPasswordDatabase(SystemRoot::open("/").value()).entryForUserId(0));
 }
