@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "base/ZORLocks.h"
 
+#include "base/Assert.h"
 #include "base/BlockingScope.h"
 
 #include <algorithm>
@@ -99,13 +100,15 @@ void ZORLocks::acquire(Record& record, std::string_view identifier, LockMode mod
             record.lock.lock();
         }
         std::int32_t expected = 0;
-        record.lockState.compare_exchange_strong(expected, -1);
+        const bool wasFree = record.lockState.compare_exchange_strong(expected, -1);
+        ZOR_ASSERT(wasFree);
     } else {
         if (!record.lock.try_lock_shared()) {
             const BlockingScope blocking;
             record.lock.lock_shared();
         }
-        record.lockState.fetch_add(1);
+        const std::int32_t readers = record.lockState.fetch_add(1);
+        ZOR_ASSERT(readers >= 0);
     }
     if (log_.writes(logLevelDebug))
         log_.write(logLevelDebug, takeFunction, "Got lock on identifier %.*s", shownBytes(identifier),
@@ -120,7 +123,9 @@ void ZORLocks::unlock_one_lock(std::string_view identifier) noexcept {
         return;
     }
     Record& record = *found->second;
+    ZOR_ASSERT(record.userCount > 0);
     if (record.lockState == -1) {
+        ZOR_ASSERT(identifierWriterCount_ > 0);
         record.lockState = 0;
         --identifierWriterCount_;
         ++writersEnded_;
@@ -131,6 +136,7 @@ void ZORLocks::unlock_one_lock(std::string_view identifier) noexcept {
         --record.userCount;
         record.lock.unlock();
     } else {
+        ZOR_ASSERT(identifierReaderCount_ > 0);
         record.lockState.fetch_sub(1);
         --identifierReaderCount_;
         if (everythingIsFree())
@@ -154,6 +160,7 @@ void ZORLocks::_lock_all_identifiers(LockMode mode) noexcept {
                 yield();
             else
                 waitForAll(allWriter_);
+        ZOR_ASSERT(writersBegun_ == writersEnded_);
         allReaderWriterState_ = -1;
         ++writersBegun_;
     } else {

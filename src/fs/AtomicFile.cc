@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/AtomicFile.h"
 
+#include "base/Assert.h"
 #include "os/FileDescriptor.h"
 #include "os/Openat2.h"
 
@@ -59,6 +60,7 @@ int writeNewFile(platform::Disk& disk, int directory, const char* name, mode_t m
 
 int replaceFileDurably(platform::Disk& disk, int directory, const std::string& name, mode_t mode,
                        std::span<const std::uint8_t> bytes, const std::function<int(int file)>& prepare) {
+    ZOR_ASSERT(!name.empty() && name.find('/') == std::string::npos);
     const std::string prefix = "." + name + std::string(temporaryMark);
     std::string temporary = prefix + std::string(usualSuffix);
     int descriptor = writeNewFile(disk, directory, temporary.c_str(), mode, bytes);

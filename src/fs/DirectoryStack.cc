@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/DirectoryStack.h"
 
+#include "base/Assert.h"
 #include "os/Openat2.h"
 
 #include <fcntl.h>
@@ -24,9 +25,12 @@ std::string_view DirectoryStack::nameOf(std::size_t level) const {
 }
 
 void DirectoryStack::push(FileDescriptor directory, dev_t device, ino_t inode, std::string_view name) {
+    ZOR_ASSERT(directory.valid());
     if (levels_.empty()) {
         device_ = device;
     } else {
+        // A component with a separator would name another level when the way down is gone once more.
+        ZOR_ASSERT(!name.empty() && name.find('/') == std::string_view::npos);
         if (levels_.size() > 1)
             path_ += '/';
         path_ += name;
@@ -36,6 +40,7 @@ void DirectoryStack::push(FileDescriptor directory, dev_t device, ino_t inode, s
 }
 
 void DirectoryStack::pop() {
+    ZOR_ASSERT(!levels_.empty());
     truncate(levels_.size() - 1);
 }
 
@@ -109,6 +114,7 @@ std::size_t DirectoryStack::reopenFromRoot(std::size_t last) {
 }
 
 BulkDirectoryRead& DirectoryStack::reader() {
+    ZOR_ASSERT(!levels_.empty());
     Slot& slot = slots_[slotOf(levels_.size() - 1)];
     if (!slot.reader) {
         if (!slot.buffer)

@@ -1,6 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "os/RunLoop.h"
 
+#include "base/Assert.h"
+
 #include <algorithm>
 #include <array>
 #include <cerrno>
@@ -37,6 +39,7 @@ RunLoop::RunLoop()
 }
 
 bool RunLoop::watch(int fd, std::function<void()> ready) {
+    ZOR_ASSERT(ready);
     const MutexLock lock(mutex_);
     epoll_event event{};
     event.events = EPOLLIN;
@@ -62,6 +65,7 @@ void RunLoop::unwatch(int fd) {
 }
 
 void RunLoop::post(std::function<void()> job) {
+    ZOR_ASSERT(job);
     {
         const MutexLock lock(mutex_);
         posted_.push_back(std::move(job));
@@ -70,6 +74,7 @@ void RunLoop::post(std::function<void()> job) {
 }
 
 unsigned RunLoop::addTimer(std::function<void()> job) {
+    ZOR_ASSERT(job);
     auto shared = std::make_shared<std::function<void()>>(std::move(job));
     const MutexLock lock(mutex_);
     timers_[++lastTimer_] = {.job = std::move(shared), .due = {}};
@@ -87,6 +92,7 @@ void RunLoop::removeTimer(unsigned timer) {
 }
 
 void RunLoop::setTimer(unsigned timer, std::chrono::milliseconds delay) {
+    ZOR_ASSERT(delay.count() >= 0);
     const auto due = std::chrono::steady_clock::now() + delay;
     {
         const MutexLock lock(mutex_);

@@ -1,6 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "os/SerialWorkQueue.h"
 
+#include "base/Assert.h"
+
 #include <exception>
 #include <pthread.h>
 #include <sys/resource.h>
@@ -75,6 +77,7 @@ bool SerialWorkQueue::start() {
 }
 
 void SerialWorkQueue::async(std::function<void()> job) {
+    ZOR_ASSERT(job); // an empty one would end the thread
     {
         const MutexLock lock(mutex_);
         if (finished_)
@@ -86,6 +89,7 @@ void SerialWorkQueue::async(std::function<void()> job) {
 
 void SerialWorkQueue::suspend() {
     const MutexLock lock(mutex_);
+    ZOR_ASSERT(!suspended_);
     suspended_ = !ending_;
 }
 

@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "service/ListenerLimits.h"
 
+#include "base/Assert.h"
+
 #include <algorithm>
-#include <cstdio>
-#include <cstdlib>
 
 namespace zor::platform {
 
@@ -38,24 +38,12 @@ ListenerLimits ListenerLimits::forUsers(const ipc::UserNumbers& owners) const {
     return limits;
 }
 
-namespace {
-
-void mustHold(bool condition, const char* what) {
-    if (!condition) {
-        std::fprintf(stderr, "listener charges: %s\n", what);
-        std::abort();
-    }
-}
-
-} // namespace
-
 ListenerCharges::~ListenerCharges() {
     const MutexLock lock(mutex_);
-    mustHold(totals_.connections == 0, "connections do not balance");
-    mustHold(totals_.inputBytes == 0, "input bytes do not balance");
-    mustHold(totals_.outputBytes == 0, "output bytes do not balance");
-    mustHold(ofOthers_.connections == 0 && ofOthers_.inputBytes == 0 && ofOthers_.outputBytes == 0,
-             "what others have does not balance");
+    ZOR_ASSERT(totals_.connections == 0);
+    ZOR_ASSERT(totals_.inputBytes == 0);
+    ZOR_ASSERT(totals_.outputBytes == 0);
+    ZOR_ASSERT(ofOthers_.connections == 0 && ofOthers_.inputBytes == 0 && ofOthers_.outputBytes == 0);
 }
 
 ListenerCharges::Account* ListenerCharges::openConnection(uid_t uid, bool ownsRoot) {
@@ -78,20 +66,20 @@ ListenerCharges::Account* ListenerCharges::openConnection(uid_t uid, bool ownsRo
 
 void ListenerCharges::closeConnection(Account& account) {
     const MutexLock lock(mutex_);
-    mustHold(account.connections > 0, "a connection is closed twice");
-    mustHold(totals_.connections >= account.connections, "a user has more connections than there are");
+    ZOR_ASSERT(account.connections > 0);
+    ZOR_ASSERT(totals_.connections >= account.connections);
     if (!account.ownsRoot)
         --ofOthers_.connections;
     --totals_.connections;
     if (--account.connections > 0)
         return;
-    mustHold(account.inputBytes == 0, "a user's input bytes do not balance");
-    mustHold(account.outputBytes == 0, "a user's output bytes do not balance");
+    ZOR_ASSERT(account.inputBytes == 0);
+    ZOR_ASSERT(account.outputBytes == 0);
 }
 
 bool ListenerCharges::changeInput(Account& account, std::size_t before, std::size_t after) {
     const MutexLock lock(mutex_);
-    mustHold(account.inputBytes >= before, "more input bytes are given back than were taken");
+    ZOR_ASSERT(account.inputBytes >= before);
     const std::size_t ofUser = account.inputBytes - before + after;
     const std::size_t ofOthers = account.ownsRoot ? ofOthers_.inputBytes : ofOthers_.inputBytes - before + after;
     const std::size_t inAll = totals_.inputBytes - before + after;
@@ -107,7 +95,7 @@ bool ListenerCharges::changeInput(Account& account, std::size_t before, std::siz
 
 bool ListenerCharges::changeOutput(Account& account, std::size_t before, std::size_t after) {
     const MutexLock lock(mutex_);
-    mustHold(account.outputBytes >= before, "more output bytes are given back than were taken");
+    ZOR_ASSERT(account.outputBytes >= before);
     const std::size_t ofUser = account.outputBytes - before + after;
     const std::size_t ofOthers = account.ownsRoot ? ofOthers_.outputBytes : ofOthers_.outputBytes - before + after;
     const bool tooMuchOfOthers = ofUser > limits_.outputBytesMaxPerUser || ofOthers > limits_.outputBytesMaxOfOthers;

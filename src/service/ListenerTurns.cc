@@ -1,6 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "service/ListenerTurns.h"
 
+#include "base/Assert.h"
+
 #include <utility>
 
 namespace zor::platform {
@@ -25,6 +27,7 @@ void ListenerTurns::requeue(ListenerTask& task) {
 
 void ListenerTurns::append(ListenerTask& task) {
     ListenerLine& line = task.line();
+    ZOR_ASSERT(!task.waits_);
     task.waits_ = true;
     task.next_ = nullptr;
     (line.last_ ? line.last_->next_ : line.first_) = &task;
@@ -38,6 +41,7 @@ void ListenerTurns::append(ListenerTask& task) {
 }
 
 void ListenerTurns::join(ListenerLine& line) {
+    ZOR_ASSERT(!line.inRing_ && line.waiting_ > 0);
     Ring& ring = line.isOwners_ ? owners_ : others_;
     line.next_ = nullptr;
     (ring.last ? ring.last->next_ : ring.first) = &line;
@@ -48,6 +52,7 @@ void ListenerTurns::join(ListenerLine& line) {
 
 ListenerLine* ListenerTurns::leaveFirst(Ring& ring) {
     ListenerLine* const line = ring.first;
+    ZOR_ASSERT(line && line->inRing_ && linesInRings_ > 0);
     ring.first = std::exchange(line->next_, nullptr);
     if (!ring.first)
         ring.last = nullptr;
@@ -75,6 +80,7 @@ ListenerTurns::Turn ListenerTurns::takeFrom(Ring& ring) {
             }
             line.standsAside_ = false;
         }
+        ZOR_ASSERT(line.first_ && line.waiting_ > 0 && count_ > 0);
         ListenerTask* const task = std::exchange(line.first_, line.first_->next_);
         if (!line.first_)
             line.last_ = nullptr;

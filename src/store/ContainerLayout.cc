@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ContainerLayout.h"
 
+#include "base/Assert.h"
 #include "store/Names.h"
 
 namespace zor {
@@ -12,6 +13,7 @@ constexpr const char* groupSubdirectories[] = {"Library", "Library/Caches"};
 } // namespace
 
 ContainerLayout layoutOf(ContainerClass containerClass, std::uint32_t userId) {
+    ZOR_ASSERT(isValidClass(containerClass));
     ContainerLayout layout;
     if (isBundleClass(containerClass)) {
         layout.topLevelOwner = userId;

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ZORContainerCache.h"
 
+#include "base/Assert.h"
 #include "fs/PathResolver.h"
 #include "plist/Value.h"
 #include "store/Names.h"
@@ -64,6 +65,7 @@ ZORContainerCache::Entry ZORContainerCache::entryOf(Record record) {
 }
 
 void ZORContainerCache::store(ClassCache& cache, Entry entry) {
+    ZOR_ASSERT(entry.record);
     remove(cache, entry.record->identifier());
     const std::size_t bytes = entry.infoBytes;
     cache.entries.insert(std::move(entry));
@@ -74,6 +76,7 @@ void ZORContainerCache::remove(ClassCache& cache, std::string_view identifier) {
     const auto known = cache.entries.find(identifier);
     if (known == cache.entries.end())
         return;
+    ZOR_ASSERT(cache.infoBytes >= known->infoBytes);
     cache.infoBytes -= known->infoBytes;
     cache.entries.erase(known);
 }

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ZOREntitlementMapping.h"
 
+#include "base/Assert.h"
 #include "base/BlockingScope.h"
 #include "base/UserIdentity.h"
 #include "fs/DictionaryFile.h"
@@ -121,6 +122,7 @@ std::optional<plist::Value> ZOREntitlementMapping::_onQueue_store(const std::str
     const auto held = [&](const std::optional<plist::Value>& one) {
         return one ? sizeof(std::string) + key.size() + plist::heldBytes(*one) : 0;
     };
+    ZOR_ASSERT(heldBytes_ >= held(before));
     const std::size_t bytes = heldBytes_ - held(before) + held(value);
     if (value)
         entitlementMappingDict_.set(key, std::move(*value));
@@ -189,6 +191,7 @@ Result<void> ZOREntitlementMapping::save(Change change, const std::function<void
         const MutexLock held(entitlementQueue_);
         if (saved_ >= change)
             return {};
+        ZOR_ASSERT(change <= applied_);
         map = entitlementMappingDict_;
         last = applied_;
     }
