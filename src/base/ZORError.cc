@@ -5,7 +5,6 @@
 
 #include <bit>
 #include <cerrno>
-#include <cstring>
 
 namespace zor {
 
@@ -14,7 +13,7 @@ std::string ZORError::text() const {
 }
 
 bool ZORError::isOwnShortage() const {
-    return (domain_ == ErrorDomain::posix && zor::isOwnShortage(code_)) ||
+    return (domain_ == ErrorDomain::posix && zor::isOwnShortage(Errno(code_))) ||
            (underlying_ && underlying_->isOwnShortage());
 }
 
@@ -104,17 +103,20 @@ ZORError makeError(const Log& log, Here here, ErrorCode code, const ZORError* un
     return error;
 }
 
+ZORError posixError(Here here, Errno error, const char* format, ...) {
+    std::va_list arguments;
+    va_start(arguments, format);
+    ZORError made(here, ErrorDomain::posix, error.number(), formattedList(format, arguments));
+    va_end(arguments);
+    return made;
+}
+
 ZORError posixError(Here here, int number, const char* format, ...) {
     std::va_list arguments;
     va_start(arguments, format);
     ZORError error(here, ErrorDomain::posix, number, formattedList(format, arguments));
     va_end(arguments);
     return error;
-}
-
-const char* errorText(int number) {
-    const char* text = strerrordesc_np(number);
-    return text ? text : "Unknown error";
 }
 
 } // namespace zor

@@ -6,6 +6,8 @@
 
 #include "base/ErrorCode.h"
 #include "base/Log.h"
+#include "base/Try.h"
+#include "platform/Errno.h"
 
 #include <cstdint>
 #include <expected>
@@ -71,13 +73,20 @@ ZORError makeError(const Log& log, Here here, ErrorCode code, const ZORError* un
                    const char* format, ...) __attribute__((format(printf, 6, 7)));
 
 /// An error of the POSIX domain; never logs.
+ZORError posixError(Here here, Errno error, const char* format, ...) __attribute__((format(printf, 3, 4)));
+
 ZORError posixError(Here here, int number, const char* format, ...) __attribute__((format(printf, 3, 4)));
 
 /// The level-3 line of an error that was made without one.
 void logError(const Log& log, const ZORError& error);
 
 /// The text of an errno value, safe in any thread.
-const char* errorText(int number);
+inline const char* errorText(int number) {
+    return Errno(number).text();
+}
+inline const char* errorText(Errno error) {
+    return error.text();
+}
 
 template <typename T>
 class [[nodiscard]] Result : public std::expected<T, ZORError> {
@@ -93,21 +102,9 @@ public:
     Result(ZORError error) : std::expected<void, ZORError>(std::unexpect, std::move(error)) {}
 };
 
-} // namespace zor
-
-/// The value of a Result; an error leaves the function with it.
-#define TRY(expression)                                                                                                \
-    __extension__({                                                                                                    \
-        auto zorResult_ = (expression);                                                                                \
-        if (!zorResult_)                                                                                               \
-            return std::move(zorResult_).error();                                                                      \
-        ::zor::takeValue(zorResult_);                                                                                  \
-    })
-
-namespace zor {
 template <typename T>
-T takeValue(Result<T>& result) {
-    return std::move(*result);
+ZORError takeError(Result<T>& result) {
+    return std::move(result).error();
 }
-inline void takeValue(Result<void>&) {}
+
 } // namespace zor

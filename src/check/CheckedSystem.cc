@@ -14,16 +14,16 @@ namespace zor::check {
 std::expected<std::unique_ptr<CheckedSystem>, std::string> CheckedSystem::open(const std::string& rootDirectory) {
     auto root = platform::SystemRoot::open(rootDirectory);
     if (!root)
-        return std::unexpected("cannot open the root " + rootDirectory + ": " + errorText(root.error()));
+        return std::unexpected("cannot open the root " + rootDirectory + ": " + root.error().text());
     struct stat status{};
     if (::fstat(root->descriptor(), &status) != 0)
-        return std::unexpected("cannot look at the root " + rootDirectory + ": " + errorText(errno));
+        return std::unexpected("cannot look at the root " + rootDirectory + ": " + Errno::last().text());
     if (status.st_uid != ::geteuid())
         return std::unexpected("the root " + rootDirectory + " belongs to user " + std::to_string(status.st_uid) +
                                "; only that user sees what the daemon sees");
     // Without it nothing has run there since the boot.
-    if (const int failure = root->openRuntimeDirectory(); failure != 0 && failure != ENOENT)
-        return std::unexpected("cannot open the daemon's runtime directory: " + std::string(errorText(failure)));
+    if (const Errno failure = root->openRuntimeDirectory(); failure && failure != ENOENT)
+        return std::unexpected("cannot open the daemon's runtime directory: " + std::string(failure.text()));
     auto configured = platform::configuredUsers(*root, platform::LinuxPasswordDatabase(*root));
     if (!configured)
         return std::unexpected(std::move(configured).error());

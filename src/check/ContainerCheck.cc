@@ -211,7 +211,7 @@ std::shared_ptr<ZORMetadata> ContainerCheck::readRecord(const ClassDirectory& di
         return std::move(*read);
     // Nobody can tell its owner while the key of its encryption is away: it may well be whole.
     if (const ZORError* cause = read.error().error.underlying(); cause && cause->isPosix(ENOKEY)) {
-        look_.addUnexamined(directory.url.appendingDirectory(name), ENOKEY).user = directory.user;
+        look_.addUnexamined(directory.url.appendingDirectory(name), Errno(ENOKEY)).user = directory.user;
         return nullptr;
     }
     struct stat status{};
@@ -356,13 +356,13 @@ bool ContainerCheck::checkSubdirectory(const Container& container, const Contain
     const FileURL url = container.url.appendingDirectory(subdirectory);
     const auto item = openBeneathOnMount(container.descriptor, subdirectory, O_PATH | O_NOFOLLOW);
     struct stat status{};
-    const int error = !item ? item.error() : ::fstat(item->get(), &status) != 0 ? errno : 0;
+    const Errno error = !item ? item.error() : ::fstat(item->get(), &status) != 0 ? Errno::last() : Errno();
     if (error == ENOENT) {
         describe(look_.add(FindingCode::subdirectoryMissing, url, "is missing", Mender::daemon), container);
         return false;
     }
     // With O_PATH a link in the last place may be given or refused; it is a link in both cases.
-    if (error == ELOOP || error == ENOTDIR || (error == 0 && !S_ISDIR(status.st_mode))) {
+    if (error == ELOOP || error == ENOTDIR || (!error && !S_ISDIR(status.st_mode))) {
         const bool isLink = error == ELOOP || S_ISLNK(status.st_mode);
         describe(
             look_.addForPerson(FindingCode::wrongShape, url,
@@ -371,7 +371,7 @@ bool ContainerCheck::checkSubdirectory(const Container& container, const Contain
             container);
         return false;
     }
-    if (error != 0) {
+    if (error) {
         look_.addUnexamined(url, error);
         return false;
     }
@@ -399,8 +399,7 @@ void ContainerCheck::checkProtection(const Container& container, const char* sub
     const auto number = value ? value->asSigned() : std::nullopt;
     const std::int64_t recorded = number.value_or(platform::defaultProtectionClass);
     const auto directory = openBeneathOnMount(descriptor, ".", O_RDONLY | O_DIRECTORY);
-    const auto found =
-        directory ? look_.device().protection().classOf(directory->get()) : std::unexpected(directory.error());
+    const auto found = directory ? look_.device().protection().classOf(directory->get()) : directory.error();
     if (!found || *found == recorded || *found == protectionClassKept)
         return;
     const std::string protect = programFor("zorvanectl", look_.device().root().canonicalPath()) + " protect --class " +

@@ -28,12 +28,12 @@ void Look::addUser(std::uint32_t userId) {
     if (home)
         system_.fileManager().resolver().fence(*home, fs::MountFence::Kind::home);
     struct stat status{};
-    const int error = home ? system_.fileManager().resolver().status(*home, status) : home.error();
+    const Errno error = home ? Errno(system_.fileManager().resolver().status(*home, status)) : home.error();
     if (error == ENOENT && entry)
         homeless_.insert(userId);
-    if (error == 0 && system_.fileManager().resolver().status(StorePlaces::userBaseDirectory(*home), status) == ENOENT)
+    if (!error && system_.fileManager().resolver().status(StorePlaces::userBaseDirectory(*home), status) == ENOENT)
         homeless_.insert(userId);
-    if (error == 0)
+    if (!error)
         users_.push_back({userId, std::move(*home)});
     else if (error != ENOENT)
         addUnexamined(looked, error).user = userId;
@@ -54,8 +54,8 @@ Finding& Look::addForPerson(FindingCode code, const FileURL& url, std::string wh
     return finding;
 }
 
-Finding& Look::addUnexamined(const FileURL& url, int error) {
-    return addForPerson(FindingCode::unexamined, url, std::string("cannot be looked at: ") + errorText(error),
+Finding& Look::addUnexamined(const FileURL& url, Errno error) {
+    return addForPerson(FindingCode::unexamined, url, std::string("cannot be looked at: ") + error.text(),
                         "ls -ld " + shellQuoted(url.path()));
 }
 
@@ -83,7 +83,7 @@ bool Look::isHidden(const FileURL& url) {
     ZORFileManager& fileManager = system_.fileManager();
     const auto hider = fs::hiddenBy(fileManager.resolver(), fileManager.disk(), url);
     if (hider && hiding_.insert(hider->path()).second)
-        addUnexamined(*hider, ENOKEY);
+        addUnexamined(*hider, Errno(ENOKEY));
     return hider.has_value();
 }
 
@@ -106,7 +106,7 @@ void Look::forEachName(int directory, const FileURL& url, const std::function<vo
     while (const auto* entry = entries.next())
         function(entry->name);
     if (entries.error() != 0)
-        addUnexamined(url, entries.error());
+        addUnexamined(url, Errno(entries.error()));
 }
 
 std::string Look::moveAside(const FileURL& url) const {

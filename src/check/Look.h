@@ -8,6 +8,7 @@
 #include "check/Repair.h"
 #include "check/StoreCheck.h"
 #include "os/FileDescriptor.h"
+#include "platform/Errno.h"
 #include "store/ZORWhitelist.h"
 
 #include <functional>
@@ -44,7 +45,7 @@ public:
     Finding& add(FindingCode code, const FileURL& url, std::string what, Mender mender);
     /// A finding that somebody who may use a shell can mend.
     Finding& addForPerson(FindingCode code, const FileURL& url, std::string what, std::string command);
-    Finding& addUnexamined(const FileURL& url, int error);
+    Finding& addUnexamined(const FileURL& url, Errno error);
 
     /// An open directory; nothing when there is none, or when there is something else, or an encryption hides it, which
     /// is then a finding.

@@ -85,9 +85,9 @@ void Daemon::setUp() {
     if (!marker.present) {
         log.write(logLevelNotice, "main", "zorvaned performing first boot initialization");
         client->rebootContainerManagerSetup();
-        if (const int failure = setup.stopped() ? 0 : platform.bootMarker.make())
+        if (const Errno failure = setup.stopped() ? Errno() : platform.bootMarker.make())
             log.write(logLevelError, "set_first_boot_work_completed", "Failed to create semaphore %s: %s",
-                      platform.bootMarker.name().c_str(), errorText(failure));
+                      platform.bootMarker.name().c_str(), failure.text());
     }
     if (!setup.stopped())
         client->containerManagerSetup();
@@ -96,11 +96,10 @@ void Daemon::setUp() {
 
 void Daemon::followLockState() {
     const platform::Platform& platform = composition_.platform();
-    const int status = platform.lockState.registerForChanges(platform.runLoop, [this] { evaluateLockState(); });
-    if (status != 0)
+    if (const Errno error = platform.lockState.registerForChanges(platform.runLoop, [this] { evaluateLockState(); }))
         composition_.log().write(logLevelError, "main", "%s failed for %s: %d",
                                  platform.lockState.registrationCallName(), platform.lockState.notificationName(),
-                                 status);
+                                 error.number());
 }
 
 void Daemon::evaluateLockState() {
@@ -123,8 +122,8 @@ bool Daemon::startUpcallServer() {
     const platform::Platform& platform = composition_.platform();
     const Log& log = composition_.log();
     constexpr const char* function = "ZORKernServerStart";
-    if (const int failure = platform.upcallPort.checkIn()) {
-        log.write(logLevelError, function, "%s: %s", platform.upcallPort.checkInCallName(), errorText(failure));
+    if (const Errno failure = platform.upcallPort.checkIn()) {
+        log.write(logLevelError, function, "%s: %s", platform.upcallPort.checkInCallName(), failure.text());
         return false;
     }
     UpcallServer& server = composition_.upcallServer();

@@ -21,18 +21,18 @@ constexpr mode_t usersFileMode = 0644;
 constexpr const char* deathRowLabel = "com.veltra.zorvaned.deathrow";
 constexpr const char* lockStateLabel = "com.veltra.zorvaned.lockstate";
 
-std::unexpected<std::string> cannot(const std::string& what, int error) {
-    return std::unexpected(what + ": " + ::strerrordesc_np(error));
+std::unexpected<std::string> cannot(const std::string& what, Errno error) {
+    return std::unexpected(what + ": " + error.text());
 }
 
-/// Writes the file that tells clients whose containers are whose, unless an earlier start has. 0 or a negative errno.
-int tellUsers(Disk& disk, int runtimeDirectory, const ipc::UserNumbers& numbers) {
+/// Writes the file that tells clients whose containers are whose, unless an earlier start has.
+Errno tellUsers(Disk& disk, int runtimeDirectory, const ipc::UserNumbers& numbers) {
     const std::string text = ipc::textOf(numbers);
     const std::span bytes(reinterpret_cast<const std::uint8_t*>(text.data()), text.size());
     const auto there = fs::readOwnedFile(disk, runtimeDirectory, names::usersFile, bytes.size());
     if (there && std::ranges::equal(*there, bytes))
-        return 0;
-    return fs::replaceFileDurably(disk, runtimeDirectory, names::usersFile, usersFileMode, bytes);
+        return Errno();
+    return Errno(-fs::replaceFileDurably(disk, runtimeDirectory, names::usersFile, usersFileMode, bytes));
 }
 
 } // namespace
@@ -49,7 +49,7 @@ std::expected<std::unique_ptr<LinuxPlatform>, std::string> LinuxPlatform::open(O
         options.syncs = Syncs::on;
     LinuxDisk disk(options.syncs);
     const std::string runtime = root->path(names::runtimeDirectory);
-    if (const int error = root->makeRuntimeDirectory(disk); error != 0)
+    if (const Errno error = root->makeRuntimeDirectory(disk))
         return cannot("cannot make " + runtime, error);
     auto lock = DaemonLock::take(*root);
     if (!lock && lock.error() == EWOULDBLOCK)
@@ -59,8 +59,8 @@ std::expected<std::unique_ptr<LinuxPlatform>, std::string> LinuxPlatform::open(O
     auto users = configuredUsers(*root, LinuxPasswordDatabase(*root));
     if (!users)
         return std::unexpected(std::move(users).error());
-    if (const int failed = tellUsers(disk, root->runtimeDirectory(), users->numbers))
-        return cannot("cannot write " + runtime + "/" + names::usersFile, -failed);
+    if (const Errno failed = tellUsers(disk, root->runtimeDirectory(), users->numbers))
+        return cannot("cannot write " + runtime + "/" + names::usersFile, failed);
     return std::unique_ptr<LinuxPlatform>(
         new LinuxPlatform(std::move(*root), std::move(*lock), std::move(*users), std::move(options)));
 }

@@ -142,8 +142,8 @@ void openStatus(platform::LinuxPlatform& platform, platform::StatusSocket& socke
     const platform::ListenerAddress address{.directory = platform.root().runtimeDirectory(),
                                             .directoryPath = platform.root().path(runtimeDirectory),
                                             .name = statusSocket};
-    if (const int failure = passed.valid() ? socket.adopt(std::move(passed)) : socket.open(address))
-        log.write(logLevelError, "main", "No status socket: %s", errorText(failure));
+    if (const Errno failure = passed.valid() ? socket.adopt(std::move(passed)) : socket.open(address))
+        log.write(logLevelError, "main", "No status socket: %s", failure.text());
 }
 
 } // namespace

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "device/FileCrashAnnotation.h"
 
+#include "base/Try.h"
 #include "os/Names.h"
 #include "os/Openat2.h"
 
@@ -18,27 +19,25 @@ constexpr std::size_t messageBytesMax = 1024 * 1024;
 
 void FileCrashAnnotation::record(std::string_view message) {
     message = message.substr(0, messageBytesMax);
-    if (replaceFile(message) != 0)
+    if (replaceFile(message))
         ::syslog(LOG_DAEMON | LOG_CRIT, "%.*s", static_cast<int>(message.size()), message.data());
 }
 
-int FileCrashAnnotation::replaceFile(std::string_view message) {
-    const auto directory = openBeneath(root_.descriptor(), names::logDirectory, O_RDONLY | O_DIRECTORY);
-    if (!directory)
-        return directory.error();
+Errno FileCrashAnnotation::replaceFile(std::string_view message) {
+    const FileDescriptor directory = TRY(openBeneath(root_.descriptor(), names::logDirectory, O_RDONLY | O_DIRECTORY));
     const std::string temporary = std::string(".") + names::crashFile;
-    (void)disk_.unlinkFile(directory->get(), temporary.c_str());
-    const FileDescriptor file(disk_.createFile(directory->get(), temporary.c_str(), fileMode));
+    (void)disk_.unlinkFile(directory.get(), temporary.c_str());
+    const FileDescriptor file(disk_.createFile(directory.get(), temporary.c_str(), fileMode));
     if (!file.valid())
-        return EIO;
+        return Errno(EIO);
     int result = disk_.write(file.get(), {reinterpret_cast<const std::uint8_t*>(message.data()), message.size()});
     if (result == 0)
         result = disk_.sync(file.get());
     if (result == 0)
-        result = disk_.rename(directory->get(), temporary.c_str(), directory->get(), names::crashFile, 0);
+        result = disk_.rename(directory.get(), temporary.c_str(), directory.get(), names::crashFile, 0);
     if (result == 0)
-        result = disk_.sync(directory->get());
-    return -result;
+        result = disk_.sync(directory.get());
+    return Errno(-result);
 }
 
 } // namespace zor::platform

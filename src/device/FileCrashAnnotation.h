@@ -6,6 +6,7 @@
 #include "os/SystemRoot.h"
 #include "platform/Device.h"
 #include "platform/Disk.h"
+#include "platform/Errno.h"
 
 namespace zor::platform {
 
@@ -16,7 +17,7 @@ public:
     void record(std::string_view message) override;
 
 private:
-    [[nodiscard]] int replaceFile(std::string_view message);
+    Errno replaceFile(std::string_view message);
 
     const SystemRoot& root_;
     Disk& disk_;

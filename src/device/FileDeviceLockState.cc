@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "device/FileDeviceLockState.h"
 
-#include "base/ErrorCode.h"
+#include "base/Try.h"
 #include "os/Inotify.h"
 #include "os/Names.h"
 #include "os/Openat2.h"
@@ -47,7 +47,7 @@ bool FileDeviceLockState::Known::isOf(const struct stat& status) const {
 int FileDeviceLockState::currentState() const {
     struct stat status{};
     if (::fstatat(root_.runtimeDirectory(), names::lockState, &status, AT_SYMLINK_NOFOLLOW) != 0)
-        return stateUnread(errno);
+        return stateUnread(Errno::last());
     {
         const MutexLock held(mutex_);
         if (known_ && known_->isOf(status))
@@ -78,7 +78,7 @@ int FileDeviceLockState::readState() const {
     return state;
 }
 
-int FileDeviceLockState::stateUnread(int error) const {
+int FileDeviceLockState::stateUnread(Errno error) const {
     if (error == ENOENT)
         return unlocked;
     if (isOwnShortage(error) && again_)
@@ -90,35 +90,34 @@ const char* FileDeviceLockState::notificationName() const {
     return names::lockState;
 }
 
-int FileDeviceLockState::registerForChanges(RunLoop& loop, std::function<void()> changed) {
+Errno FileDeviceLockState::registerForChanges(RunLoop& loop, std::function<void()> changed) {
     loop_ = &loop;
     changed_ = std::move(changed);
     again_.emplace(loop, [this] { lookAgain(); });
-    const int error = follow();
-    if (error != 0)
+    const Errno error = follow();
+    if (error)
         again_->set(lookEvery);
     return error;
 }
 
-int FileDeviceLockState::follow() {
+Errno FileDeviceLockState::follow() {
     FileDescriptor inotify(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
     if (!inotify.valid())
-        return errno;
-    if (const auto watch = watchDirectory(inotify.get(), root_.runtimeDirectory(), watchedEvents); !watch)
-        return watch.error();
+        return Errno::last();
+    (void)TRY(watchDirectory(inotify.get(), root_.runtimeDirectory(), watchedEvents));
     const bool watched = loop_->watch(inotify.get(), [this] {
         if (takeEvents())
             changed_();
     });
     if (!watched)
-        return ENOMEM;
+        return Errno(ENOMEM);
     inotify_ = std::move(inotify);
-    return 0;
+    return Errno();
 }
 
 void FileDeviceLockState::lookAgain() {
     // Before the look: what changes after it is then noticed.
-    if (!inotify_.valid() && follow() != 0)
+    if (!inotify_.valid() && follow())
         again_->set(lookEvery);
     changed_();
 }

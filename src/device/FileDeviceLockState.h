@@ -14,6 +14,7 @@
 #include "os/RunLoop.h"
 #include "os/SystemRoot.h"
 #include "platform/Device.h"
+#include "platform/Errno.h"
 
 #include <optional>
 #include <sys/stat.h>
@@ -27,7 +28,7 @@ public:
     explicit FileDeviceLockState(const SystemRoot& root) : root_(root) {}
     [[nodiscard]] int currentState() const override;
     /// Once. The loop outlives this object, and has ended when it goes.
-    int registerForChanges(RunLoop& loop, std::function<void()> changed) override;
+    Errno registerForChanges(RunLoop& loop, std::function<void()> changed) override;
     [[nodiscard]] const char* registrationCallName() const override { return "inotify_add_watch"; }
     [[nodiscard]] const char* notificationName() const override;
 
@@ -44,10 +45,10 @@ private:
     };
     [[nodiscard]] int readState() const;
     /// The state that a look gives that failed.
-    [[nodiscard]] int stateUnread(int error) const;
+    [[nodiscard]] int stateUnread(Errno error) const;
     [[nodiscard]] bool takeEvents() const;
-    /// 0, or the errno for which there are no notices.
-    [[nodiscard]] int follow();
+    /// The error for which there are no notices.
+    Errno follow();
     void lookAgain();
 
     const SystemRoot& root_;

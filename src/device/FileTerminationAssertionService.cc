@@ -2,12 +2,12 @@
 #include "device/FileTerminationAssertionService.h"
 
 #include "base/Format.h"
+#include "base/Try.h"
 #include "os/Names.h"
 #include "os/Openat2.h"
 
 #include <cerrno>
 #include <chrono>
-#include <cstring>
 #include <fcntl.h>
 #include <sys/file.h>
 #include <sys/stat.h>
@@ -24,16 +24,15 @@ constexpr mode_t fileMode = 0600;
 constexpr int lockAttemptsMax = 200;
 constexpr std::chrono::milliseconds lockAttemptInterval{5};
 
-/// 0 or an errno.
-int lockWithin(int file) {
+Errno lockWithin(int file) {
     for (int attempt = 0; attempt < lockAttemptsMax; ++attempt) {
         if (::flock(file, LOCK_EX | LOCK_NB) == 0)
-            return 0;
+            return Errno();
         if (errno != EINTR && errno != EWOULDBLOCK)
-            return errno;
+            return Errno::last();
         std::this_thread::sleep_for(lockAttemptInterval);
     }
-    return EWOULDBLOCK;
+    return Errno(EWOULDBLOCK);
 }
 
 } // namespace
@@ -62,9 +61,9 @@ FileTerminationAssertionService::acquire(std::string_view bundleIdentifier, Term
     if (name.empty() || name.size() > componentBytesMax)
         return nullptr;
     std::string identifier(bundleIdentifier);
-    const int failure = hold(identifier, reason);
-    auto assertion = std::make_unique<FileAssertion>(failure == 0 ? this : nullptr, std::move(identifier));
-    handler(failure == 0 ? std::nullopt : std::optional<std::string>(::strerrordesc_np(failure)));
+    const Errno failure = hold(identifier, reason);
+    auto assertion = std::make_unique<FileAssertion>(failure ? nullptr : this, std::move(identifier));
+    handler(failure ? std::optional<std::string>(failure.text()) : std::nullopt);
     return assertion;
 }
 
@@ -76,50 +75,45 @@ std::vector<std::string> FileTerminationAssertionService::held() const {
     return identifiers;
 }
 
-int FileTerminationAssertionService::hold(const std::string& identifier, TerminationReason reason) {
+Errno FileTerminationAssertionService::hold(const std::string& identifier, TerminationReason reason) {
     const MutexLock lock(mutex_);
     const auto found = held_.find(identifier);
     if (found != held_.end()) {
         ++found->second.holders;
-        return 0;
+        return Errno();
     }
-    auto file = lockFile(identifier, reason);
-    if (!file)
-        return file.error();
-    held_.emplace(identifier, Held{.file = std::move(*file), .holders = 1});
-    return 0;
+    held_.emplace(identifier, Held{.file = TRY(lockFile(identifier, reason)), .holders = 1});
+    return Errno();
 }
 
-std::expected<FileDescriptor, int> FileTerminationAssertionService::openDirectory() {
+ErrnoOr<FileDescriptor> FileTerminationAssertionService::openDirectory() {
     const char* const name = names::assertionDirectory;
     const int made = disk_.makeDirectory(root_.runtimeDirectory(), name, directoryMode);
     if (made < 0 && made != -EEXIST)
-        return std::unexpected(-made);
+        return Errno(-made);
     return openBeneath(root_.runtimeDirectory(), name, O_RDONLY | O_DIRECTORY);
 }
 
-std::expected<FileDescriptor, int> FileTerminationAssertionService::lockFile(const std::string& identifier,
-                                                                             TerminationReason reason) {
+ErrnoOr<FileDescriptor> FileTerminationAssertionService::lockFile(const std::string& identifier,
+                                                                  TerminationReason reason) {
     const std::string name = percentEncode(identifier);
-    const auto directory = openDirectory();
-    if (!directory)
-        return std::unexpected(directory.error());
+    const FileDescriptor directory = TRY(openDirectory());
     // A file that an earlier daemon left may be open in a launcher that waits on it; a new file cannot be.
-    const int removed = disk_.unlinkFile(directory->get(), name.c_str());
+    const int removed = disk_.unlinkFile(directory.get(), name.c_str());
     if (removed < 0 && removed != -ENOENT)
-        return std::unexpected(-removed);
-    const int created = disk_.createFile(directory->get(), name.c_str(), fileMode);
+        return Errno(-removed);
+    const int created = disk_.createFile(directory.get(), name.c_str(), fileMode);
     if (created < 0)
-        return std::unexpected(-created);
+        return Errno(-created);
     FileDescriptor file(created);
-    int failure = lockWithin(file.get());
-    if (failure == 0) {
+    Errno failure = lockWithin(file.get());
+    if (!failure) {
         const std::string text = std::to_string(static_cast<unsigned>(reason));
-        failure = -disk_.write(file.get(), {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()});
+        failure = Errno(-disk_.write(file.get(), {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()}));
     }
-    if (failure != 0) {
-        (void)disk_.unlinkFile(directory->get(), name.c_str());
-        return std::unexpected(failure);
+    if (failure) {
+        (void)disk_.unlinkFile(directory.get(), name.c_str());
+        return failure;
     }
     return file;
 }

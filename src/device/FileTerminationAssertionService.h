@@ -13,8 +13,8 @@
 #include "os/SystemRoot.h"
 #include "platform/Device.h"
 #include "platform/Disk.h"
+#include "platform/Errno.h"
 
-#include <expected>
 #include <map>
 
 namespace zor::platform {
@@ -35,11 +35,10 @@ private:
         unsigned holders = 0;
     };
 
-    /// 0 or an errno.
-    int hold(const std::string& identifier, TerminationReason reason) ZOR_EXCLUDES(mutex_);
+    Errno hold(const std::string& identifier, TerminationReason reason) ZOR_EXCLUDES(mutex_);
     void release(const std::string& identifier) ZOR_EXCLUDES(mutex_);
-    [[nodiscard]] std::expected<FileDescriptor, int> lockFile(const std::string& identifier, TerminationReason reason);
-    [[nodiscard]] std::expected<FileDescriptor, int> openDirectory();
+    [[nodiscard]] ErrnoOr<FileDescriptor> lockFile(const std::string& identifier, TerminationReason reason);
+    [[nodiscard]] ErrnoOr<FileDescriptor> openDirectory();
 
     const SystemRoot& root_;
     Disk& disk_;

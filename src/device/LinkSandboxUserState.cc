@@ -57,24 +57,23 @@ namespace {
 constexpr mode_t directoryMode = 0755;
 }
 
-std::expected<FileDescriptor, int> LinkSandboxUserState::openDirectory(int parent, const char* name, Missing missing) {
+ErrnoOr<FileDescriptor> LinkSandboxUserState::openDirectory(int parent, const char* name, Missing missing) {
     constexpr int flags = O_RDONLY | O_DIRECTORY;
     auto opened = openBeneath(parent, name, flags);
     if (opened || opened.error() != ENOENT || missing == Missing::fail)
         return opened;
     const int made = disk_.makeDirectory(parent, name, directoryMode);
     if (made < 0 && made != -EEXIST)
-        return std::unexpected(-made);
+        return Errno(-made);
     opened = openBeneath(parent, name, flags);
     if (opened && made == 0) {
         if (const int changed = disk_.changeMode(opened->get(), directoryMode); changed < 0)
-            return std::unexpected(-changed);
+            return Errno(-changed);
     }
     return opened;
 }
 
-std::expected<FileDescriptor, int> LinkSandboxUserState::directoryOf(std::uint32_t userId, SandboxItemType type,
-                                                                     Missing missing) {
+ErrnoOr<FileDescriptor> LinkSandboxUserState::directoryOf(std::uint32_t userId, SandboxItemType type, Missing missing) {
     const std::string user = std::to_string(userId);
     const std::string kind = std::to_string(static_cast<std::uint64_t>(type));
     auto directory = openDirectory(root_.runtimeDirectory(), names::sandboxDirectory, missing);
@@ -85,19 +84,19 @@ std::expected<FileDescriptor, int> LinkSandboxUserState::directoryOf(std::uint32
     return directory;
 }
 
-int LinkSandboxUserState::setMapping(std::uint32_t userId, SandboxItemType type, std::string_view identifier,
-                                     const std::optional<std::string>& path) {
+Errno LinkSandboxUserState::setMapping(std::uint32_t userId, SandboxItemType type, std::string_view identifier,
+                                       const std::optional<std::string>& path) {
     const std::string name = percentEncode(identifier);
     if (name.empty())
-        return EINVAL;
+        return Errno(EINVAL);
     if (name.size() > componentBytesMax)
-        return ENAMETOOLONG;
+        return Errno(ENAMETOOLONG);
     const auto directory = directoryOf(userId, type, path ? Missing::make : Missing::fail);
     if (!path) {
         if (!directory)
-            return directory.error() == ENOENT ? 0 : directory.error();
+            return directory.error() == ENOENT ? Errno() : directory.error();
         const int removed = disk_.unlinkFile(directory->get(), name.c_str());
-        return removed == -ENOENT ? 0 : -removed;
+        return removed == -ENOENT ? Errno() : Errno(-removed);
     }
     if (!directory)
         return directory.error();
@@ -109,11 +108,11 @@ int LinkSandboxUserState::setMapping(std::uint32_t userId, SandboxItemType type,
         made = disk_.makeSymbolicLink(path->c_str(), directory->get(), temporary.c_str());
     }
     if (made < 0)
-        return -made;
+        return Errno(-made);
     const int renamed = disk_.rename(directory->get(), temporary.c_str(), directory->get(), name.c_str(), 0);
     if (renamed < 0)
         (void)disk_.unlinkFile(directory->get(), temporary.c_str());
-    return -renamed;
+    return Errno(-renamed);
 }
 
 unsigned LinkSandboxUserState::removeDanglingMappings(const std::function<bool(std::uint32_t userId)>& mayConclude,

@@ -6,10 +6,10 @@
 #include "os/SystemRoot.h"
 #include "platform/Device.h"
 #include "platform/Disk.h"
+#include "platform/Errno.h"
 
 #include <atomic>
 #include <cstdint>
-#include <expected>
 #include <functional>
 #include <optional>
 #include <string>
@@ -48,16 +48,15 @@ class LinkSandboxUserState final : public SandboxUserState {
 public:
     LinkSandboxUserState(const SystemRoot& root, Disk& disk) : root_(root), disk_(disk) {}
     /// ENAMETOOLONG when the encoded identifier is no file name any more, EINVAL when it is empty.
-    int setMapping(std::uint32_t userId, SandboxItemType type, std::string_view identifier,
-                   const std::optional<std::string>& path) override;
+    Errno setMapping(std::uint32_t userId, SandboxItemType type, std::string_view identifier,
+                     const std::optional<std::string>& path) override;
     unsigned removeDanglingMappings(const std::function<bool(std::uint32_t userId)>& mayConclude,
                                     const std::function<bool(const std::string& path)>& isGone) override;
 
 private:
     enum class Missing { fail, make };
-    [[nodiscard]] std::expected<FileDescriptor, int> openDirectory(int parent, const char* name, Missing missing);
-    [[nodiscard]] std::expected<FileDescriptor, int> directoryOf(std::uint32_t userId, SandboxItemType type,
-                                                                 Missing missing);
+    [[nodiscard]] ErrnoOr<FileDescriptor> openDirectory(int parent, const char* name, Missing missing);
+    [[nodiscard]] ErrnoOr<FileDescriptor> directoryOf(std::uint32_t userId, SandboxItemType type, Missing missing);
 
     const SystemRoot& root_;
     Disk& disk_;

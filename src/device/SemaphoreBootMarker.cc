@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "device/SemaphoreBootMarker.h"
 
+#include "base/Try.h"
 #include "os/Names.h"
 #include "os/Openat2.h"
 
@@ -66,9 +67,9 @@ BootMarker::State SemaphoreBootMarker::look() const {
     return {.present = ours || fileNamesThisBoot(), .foreign = exists && !ours};
 }
 
-int SemaphoreBootMarker::make() {
-    const int failure = makeSemaphore(look().foreign);
-    return writeFile() == 0 ? 0 : failure;
+Errno SemaphoreBootMarker::make() {
+    const Errno failure = makeSemaphore(look().foreign);
+    return writeFile() ? failure : Errno();
 }
 
 void SemaphoreBootMarker::forget() {
@@ -77,14 +78,14 @@ void SemaphoreBootMarker::forget() {
         (void)::unlinkat(directory->get(), names::bootMarkerFile, 0);
 }
 
-int SemaphoreBootMarker::makeSemaphore(bool foreign) const {
+Errno SemaphoreBootMarker::makeSemaphore(bool foreign) const {
     if (foreign && ::sem_unlink(name_.c_str()) != 0)
         (void)::rmdir(semaphoreFile(name_).c_str());
     sem_t* const made = ::sem_open(name_.c_str(), O_CREAT | O_EXCL, markerMode, 0U);
     if (made == SEM_FAILED)
-        return errno;
+        return Errno::last();
     ::sem_close(made);
-    return 0;
+    return Errno();
 }
 
 bool SemaphoreBootMarker::fileNamesThisBoot() const {
@@ -99,18 +100,19 @@ bool SemaphoreBootMarker::fileNamesThisBoot() const {
     return named && !named->empty() && *named == thisBoot();
 }
 
-int SemaphoreBootMarker::writeFile() const {
+Errno SemaphoreBootMarker::writeFile() const {
     const std::string boot = thisBoot();
-    const auto directory = openBeneath(root_.descriptor(), names::runtimeDirectory, O_PATH | O_DIRECTORY);
-    if (boot.empty() || !directory)
-        return boot.empty() ? ENOENT : directory.error();
-    (void)::unlinkat(directory->get(), names::bootMarkerFile, 0);
-    const auto file =
-        openBeneath(directory->get(), names::bootMarkerFile, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW, markerMode);
-    if (!file)
-        return file.error();
-    const ssize_t written = ::write(file->get(), boot.data(), boot.size());
-    return written == static_cast<ssize_t>(boot.size()) ? 0 : written < 0 ? errno : EIO;
+    if (boot.empty())
+        return Errno(ENOENT);
+    const FileDescriptor directory =
+        TRY(openBeneath(root_.descriptor(), names::runtimeDirectory, O_PATH | O_DIRECTORY));
+    (void)::unlinkat(directory.get(), names::bootMarkerFile, 0);
+    const FileDescriptor file =
+        TRY(openBeneath(directory.get(), names::bootMarkerFile, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW, markerMode));
+    const ssize_t written = ::write(file.get(), boot.data(), boot.size());
+    if (written < 0)
+        return Errno::last();
+    return written == static_cast<ssize_t>(boot.size()) ? Errno() : Errno(EIO);
 }
 
 } // namespace zor::platform

@@ -11,6 +11,7 @@
 
 #include "os/SystemRoot.h"
 #include "platform/Device.h"
+#include "platform/Errno.h"
 
 namespace zor::platform {
 
@@ -18,16 +19,16 @@ class SemaphoreBootMarker final : public BootMarker {
 public:
     explicit SemaphoreBootMarker(const SystemRoot& root);
     [[nodiscard]] State look() const override;
-    /// Makes both marks; an errno only where neither could be. A foreign semaphore of the name is removed first, where
+    /// Makes both marks; an error only where neither could be. A foreign semaphore of the name is removed first, where
     /// that is allowed.
-    int make() override;
+    Errno make() override;
     void forget() override;
     [[nodiscard]] std::string name() const override { return name_; }
 
 private:
-    [[nodiscard]] int makeSemaphore(bool foreign) const;
+    Errno makeSemaphore(bool foreign) const;
     [[nodiscard]] bool fileNamesThisBoot() const;
-    [[nodiscard]] int writeFile() const;
+    Errno writeFile() const;
 
     const SystemRoot& root_;
     const std::string name_;

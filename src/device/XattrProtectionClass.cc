@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "device/XattrProtectionClass.h"
 
+#include "base/Try.h"
 #include "os/FileDescriptor.h"
 #include "os/Names.h"
 
@@ -36,14 +37,11 @@ const char* chooseAttribute() {
 XattrProtectionClass::XattrProtectionClass(Disk& disk, const DeviceLockState& lockState)
     : attribute_(chooseAttribute()), disk_(disk), lockState_(lockState) {}
 
-std::expected<int, int> XattrProtectionClass::classOf(int fd) const {
-    const auto found = classIn(fd, attribute_);
-    if (!found)
-        return std::unexpected(found.error());
-    return found->value_or(defaultProtectionClass);
+ErrnoOr<int> XattrProtectionClass::classOf(int fd) const {
+    return TRY(classIn(fd, attribute_)).value_or(defaultProtectionClass);
 }
 
-std::expected<std::optional<int>, int> XattrProtectionClass::classIn(int fd, const char* attribute) {
+ErrnoOr<std::optional<int>> XattrProtectionClass::classIn(int fd, const char* attribute) {
     char text[16];
     ssize_t bytes = ::fgetxattr(fd, attribute, text, sizeof text);
     // One that was opened for its path alone is reached by the kernel's link to it.
@@ -54,7 +52,7 @@ std::expected<std::optional<int>, int> XattrProtectionClass::classIn(int fd, con
             return std::nullopt;
         if (errno == ERANGE) // a longer value is no number of ours
             return defaultProtectionClass;
-        return std::unexpected(neverLocked(errno));
+        return neverLocked(Errno::last());
     }
     int protectionClass = 0;
     const auto [end, error] = std::from_chars(text, text + bytes, protectionClass);
@@ -63,22 +61,20 @@ std::expected<std::optional<int>, int> XattrProtectionClass::classIn(int fd, con
     return protectionClass;
 }
 
-int XattrProtectionClass::setClass(int fd, int protectionClass) {
+Errno XattrProtectionClass::setClass(int fd, int protectionClass) {
     if (protectionClass < 0)
-        return EINVAL;
+        return Errno(EINVAL);
     if (lockState_.currentState() == DeviceLockState::locked) {
-        const auto current = classOf(fd);
-        if (!current)
-            return current.error();
-        if (keysGoWithLock(protectionClass) || keysGoWithLock(*current))
-            return EPERM;
+        const int current = TRY(classOf(fd));
+        if (keysGoWithLock(protectionClass) || keysGoWithLock(current))
+            return Errno(EPERM);
     }
     const std::string text = std::to_string(protectionClass);
     const int set =
         disk_.setAttribute(fd, attribute_, {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()});
     if (set == -EOPNOTSUPP)
         supported_.store(false, std::memory_order_relaxed);
-    return neverLocked(-set);
+    return neverLocked(Errno(-set));
 }
 
 } // namespace zor::platform

@@ -8,6 +8,7 @@
 
 #include "platform/Device.h"
 #include "platform/Disk.h"
+#include "platform/Errno.h"
 
 #include <atomic>
 #include <optional>
@@ -21,12 +22,12 @@ public:
     XattrProtectionClass(Disk& disk, const DeviceLockState& lockState);
 
     /// The class that an attribute of an open file says; nullopt when it has none (or its file system has none at all).
-    /// A value that is no class of ours reads as the default. Else an errno.
-    [[nodiscard]] static std::expected<std::optional<int>, int> classIn(int fd, const char* attribute);
+    /// A value that is no class of ours reads as the default.
+    [[nodiscard]] static ErrnoOr<std::optional<int>> classIn(int fd, const char* attribute);
 
-    [[nodiscard]] std::expected<int, int> classOf(int fd) const override;
+    [[nodiscard]] ErrnoOr<int> classOf(int fd) const override;
     /// EINVAL for a negative class.
-    int setClass(int fd, int protectionClass) override;
+    Errno setClass(int fd, int protectionClass) override;
     [[nodiscard]] bool supported() const override { return supported_.load(std::memory_order_relaxed); }
     [[nodiscard]] const char* attributeName() const { return attribute_; }
 

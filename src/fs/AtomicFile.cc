@@ -86,7 +86,7 @@ int replaceFileDurably(platform::Disk& disk, int directory, const std::string& n
     }
     // The directory descriptor may be O_PATH, which cannot be synced.
     const auto listing = platform::openBeneath(directory, ".", O_RDONLY | O_DIRECTORY);
-    return listing ? disk.sync(listing->get()) : -listing.error();
+    return listing ? disk.sync(listing->get()) : -listing.error().number();
 }
 
 namespace {
@@ -101,14 +101,14 @@ int judge(const struct stat& status, std::size_t bytesMax, std::optional<uid_t> 
 
 } // namespace
 
-std::expected<plist::Data, int> readOwnedFile(platform::Disk& disk, int directory, const char* path,
-                                              std::size_t bytesMax, std::optional<uid_t> formerOwner) {
+ErrnoOr<plist::Data> readOwnedFile(platform::Disk& disk, int directory, const char* path, std::size_t bytesMax,
+                                   std::optional<uid_t> formerOwner) {
     const auto file = platform::openBeneathOnMount(directory, path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
     if (!file)
-        return std::unexpected(file.error());
+        return file.error();
     struct stat status{};
     if (::fstat(file->get(), &status) != 0)
-        return std::unexpected(errno);
+        return Errno::last();
     if (const int refused = judge(status, bytesMax, formerOwner))
         return std::unexpected(refused);
     // One that grows meanwhile is read to its old size.

@@ -3,11 +3,11 @@
 #pragma once
 
 #include "platform/Disk.h"
+#include "platform/Errno.h"
 #include "plist/Value.h"
 
 #include <cstddef>
 #include <cstdint>
-#include <expected>
 #include <functional>
 #include <optional>
 #include <span>
@@ -52,8 +52,7 @@ inline constexpr std::size_t metadataFileBytesMax = std::size_t{1} << 20;
 /// The file must be regular, have one link, belong to root or the daemon's user (or to `formerOwner`, for files of an
 /// older system), not be writable by group or others, and hold at most `bytesMax`; else EPERM or EFBIG. Opening cannot
 /// block, whatever is found there. Any thread.
-[[nodiscard]] std::expected<plist::Data, int> readOwnedFile(platform::Disk& disk, int directory, const char* path,
-                                                            std::size_t bytesMax,
-                                                            std::optional<uid_t> formerOwner = std::nullopt);
+[[nodiscard]] ErrnoOr<plist::Data> readOwnedFile(platform::Disk& disk, int directory, const char* path,
+                                                 std::size_t bytesMax, std::optional<uid_t> formerOwner = std::nullopt);
 
 } // namespace zor::fs

@@ -32,7 +32,7 @@ Result<void> writeToURL(const plist::Dictionary& dictionary, const FileURL& url,
         parent ? fs::replaceFileDurably(
                      fileManager.disk(), parent->directory.get(), parent->name, 0644, bytes,
                      [&](int file) { return -fileManager.setClassAtCreation(file, classWithoutProtection); })
-               : -parent.error();
+               : -parent.error().number();
     if (status < 0)
         return posixError(ZOR_HERE, -status, "write of %s failed: %s", url.c_str(), errorText(-status));
     return {};
@@ -42,7 +42,7 @@ Result<plist::Dictionary> readDictionaryAtURL(const FileURL& url, std::size_t by
     const auto parent = fileManager.resolver().openParent(url);
     const auto bytes =
         parent ? fs::readOwnedFile(fileManager.disk(), parent->directory.get(), parent->name.c_str(), bytesMax)
-               : std::unexpected(parent.error());
+               : parent.error();
     if (!bytes)
         return posixError(ZOR_HERE, bytes.error(), "read of %s failed: %s", url.c_str(), errorText(bytes.error()));
     auto value = plist::readPropertyList(*bytes);

@@ -142,7 +142,7 @@ void Measurement::measureDirectory(const std::string& path) {
     if (!directory) {
         // A mount point is not part of the tree.
         if (directory.error() != EXDEV)
-            sayUnopened(path, directory.error());
+            sayUnopened(path, directory.error().number());
         return;
     }
     if (isInTree(directory->get()))
@@ -209,7 +209,7 @@ void Measurement::measureDepthFirst(int parent, const std::string& path, const c
     const auto directory = platform::openBeneathOnMount(parent, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!directory) {
         if (directory.error() != EXDEV)
-            sayUnopened(top, directory.error());
+            sayUnopened(top, directory.error().number());
         return;
     }
     if (!isInTree(directory->get()))

@@ -18,14 +18,14 @@ constexpr mode_t closedMode = 0700;
 OpenResult openClosed(int parent, const char* name) {
     auto opened = platform::openBeneathOnMount(parent, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!opened && (opened.error() == ENOTDIR || opened.error() == ELOOP || opened.error() == EXDEV))
-        return std::unexpected(EPERM);
+        return Errno(EPERM);
     if (!opened)
         return opened;
     struct stat status{};
     if (::fstat(opened->get(), &status) != 0)
-        return std::unexpected(errno);
+        return Errno::last();
     if (status.st_uid != ::geteuid() || (status.st_mode & 0777) != closedMode)
-        return std::unexpected(EPERM);
+        return Errno(EPERM);
     return opened;
 }
 
@@ -36,19 +36,19 @@ int makeIfMissing(platform::Disk& disk, int parent, const char* name) {
 
 } // namespace
 
-std::expected<MountTop, int> topOfMount(const PathResolver& resolver, const FileURL& url) {
+ErrnoOr<MountTop> topOfMount(const PathResolver& resolver, const FileURL& url) {
     auto directory = resolver.openDirectoryPath(url);
     if (!directory)
-        return std::unexpected(directory.error());
+        return directory.error();
     const auto mount = platform::mountIdOf(directory->get());
     if (!mount)
-        return std::unexpected(mount.error());
+        return mount.error();
     FileURL top = url;
     while (top.path() != resolver.root().canonicalPath() && top.path() != "/") {
         const FileURL above = top.deletingLastPathComponent();
         auto opened = resolver.openDirectoryPath(above);
         if (!opened)
-            return std::unexpected(opened.error());
+            return opened.error();
         const auto mountAbove = platform::mountIdOf(opened->get());
         if (!mountAbove || *mountAbove != *mount)
             break;
@@ -57,7 +57,7 @@ std::expected<MountTop, int> topOfMount(const PathResolver& resolver, const File
     }
     struct stat status{};
     if (::fstat(directory->get(), &status) != 0)
-        return std::unexpected(errno);
+        return Errno::last();
     return MountTop{
         .url = std::move(top), .directory = std::move(*directory), .identity = {status.st_dev, status.st_ino}};
 }
@@ -68,7 +68,7 @@ FileURL deathRowBelow(const FileURL& top) {
 
 OpenResult openDeathRow(int top) {
     const OpenResult outer = openClosed(top, deathRowOuter);
-    return outer ? openClosed(outer->get(), deathRowInner) : OpenResult(std::unexpected(outer.error()));
+    return outer ? openClosed(outer->get(), deathRowInner) : OpenResult(outer.error());
 }
 
 OpenResult openOrMakeDeathRow(platform::Disk& disk, int top) {
@@ -76,7 +76,7 @@ OpenResult openOrMakeDeathRow(platform::Disk& disk, int top) {
         return std::unexpected(failed);
     const OpenResult outer = openClosed(top, deathRowOuter);
     if (!outer)
-        return std::unexpected(outer.error());
+        return outer.error();
     if (const int failed = makeIfMissing(disk, outer->get(), deathRowInner))
         return std::unexpected(failed);
     return openClosed(outer->get(), deathRowInner);

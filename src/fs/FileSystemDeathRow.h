@@ -13,6 +13,7 @@
 #pragma once
 
 #include "fs/PathResolver.h"
+#include "platform/Errno.h"
 
 #include <utility>
 
@@ -25,7 +26,7 @@ struct MountTop {
     std::pair<dev_t, ino_t> identity;
 };
 /// The topmost directory of the mount that `url` lies on, from `url` up to the system root.
-[[nodiscard]] std::expected<MountTop, int> topOfMount(const PathResolver& resolver, const FileURL& url);
+[[nodiscard]] ErrnoOr<MountTop> topOfMount(const PathResolver& resolver, const FileURL& url);
 
 /// How the row is called in messages.
 [[nodiscard]] FileURL deathRowBelow(const FileURL& top);

@@ -145,16 +145,16 @@ bool MountFence::answers(Asked asked) {
 
 OpenResult MountFence::openOwn(const char* path, std::size_t ownBytes) {
     if (!answers())
-        return std::unexpected(EHOSTDOWN);
+        return Errno(EHOSTDOWN);
     auto opened = openBeneath(judgement_->root, std::string(path, ownBytes).c_str(), pathFlags);
     if (!opened || kind_ != Kind::home)
         return opened;
     const MountKind kind = judgement_->judge(opened->get());
     if (kind == MountKind::usersOwn)
-        return std::unexpected(EXDEV);
+        return Errno(EXDEV);
     // It may have been mounted a moment ago, over one that needed no question.
     if (kind == MountKind::mayHang && !answers())
-        return std::unexpected(EHOSTDOWN);
+        return Errno(EHOSTDOWN);
     return opened;
 }
 
@@ -192,7 +192,7 @@ int MountFence::status(const char* path, struct stat& status) {
     if (isOwn && kind_ == Kind::home) {
         const auto fence = openOwn(path, own);
         MountIdentity mount;
-        return fence ? statusOfDescriptor(fence->get(), status, mount) : fence.error();
+        return fence ? statusOfDescriptor(fence->get(), status, mount) : fence.error().number();
     }
     const std::string whole(path);
     const std::size_t slash = whole.rfind('/');
@@ -201,7 +201,7 @@ int MountFence::status(const char* path, struct stat& status) {
     const auto directory =
         isOwn ? openBeneath(judgement_->root, parent.c_str(), pathFlags) : open(parent.c_str(), pathFlags);
     if (!directory)
-        return directory.error();
+        return directory.error().number();
     const int error = statusOfName(directory->get(), name.c_str(), status);
     if (isOwn)
         return error == EXDEV ? 0 : error;

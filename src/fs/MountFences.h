@@ -17,11 +17,11 @@
 #include "fs/ItemStatus.h"
 #include "os/BoundedQuestion.h"
 #include "os/FileDescriptor.h"
+#include "platform/Errno.h"
 
 #include <atomic>
 #include <chrono>
 #include <cstdint>
-#include <expected>
 #include <memory>
 #include <optional>
 #include <string>
@@ -30,7 +30,7 @@
 
 namespace zor::fs {
 
-using OpenResult = std::expected<platform::FileDescriptor, int>;
+using OpenResult = ErrnoOr<platform::FileDescriptor>;
 
 /// How long a home that may stop answering is believed to answer; its requests pay one question in that time.
 inline constexpr std::chrono::milliseconds homeAnswerHolds{1000};

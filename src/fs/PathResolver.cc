@@ -12,10 +12,10 @@ namespace zor::fs {
 
 using platform::openBeneath;
 
-std::expected<DirectoryId, int> directoryIdOf(int directory) {
+ErrnoOr<DirectoryId> directoryIdOf(int directory) {
     struct statx status{};
     if (::statx(directory, "", AT_EMPTY_PATH | AT_STATX_DONT_SYNC, STATX_INO | STATX_MNT_ID, &status) != 0)
-        return std::unexpected(errno);
+        return Errno::last();
     return DirectoryId{.device = makedev(status.stx_dev_major, status.stx_dev_minor),
                        .inode = status.stx_ino,
                        .mount = status.stx_mnt_id};
@@ -58,13 +58,13 @@ void PathResolver::noteLeft(const FileURL& url, int error) const {
 OpenResult PathResolver::openItem(const FileURL& url, int flags) const {
     const char* path = relative(url);
     if (!path)
-        return std::unexpected(EXDEV);
+        return Errno(EXDEV);
     MountFence* const fence = fences_.around(path);
     if (!fence)
         return openBeneath(root_.descriptor(), path, flags | O_NOFOLLOW);
     OpenResult opened = fence->open(path, flags | O_NOFOLLOW);
     if (!opened)
-        noteLeft(url, opened.error());
+        noteLeft(url, opened.error().number());
     return opened;
 }
 
@@ -76,10 +76,10 @@ OpenResult PathResolver::openDirectoryPath(const FileURL& url) const {
     return openItem(url, O_PATH | O_DIRECTORY);
 }
 
-std::expected<ParentAndName, int> PathResolver::openParent(const FileURL& url) const {
+ErrnoOr<ParentAndName> PathResolver::openParent(const FileURL& url) const {
     OpenResult directory = openDirectoryPath(url.deletingLastPathComponent());
     if (!directory)
-        return std::unexpected(directory.error());
+        return directory.error();
     return ParentAndName{std::move(*directory), std::string(url.lastPathComponent())};
 }
 
@@ -94,14 +94,14 @@ int PathResolver::status(const FileURL& url, struct stat& status) const {
     }
     const auto parent = openParent(url);
     if (!parent)
-        return parent.error();
+        return parent.error().number();
     return ::fstatat(parent->directory.get(), parent->name.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0 ? 0 : errno;
 }
 
-std::expected<PathResolver::Way, int> PathResolver::wayTo(const FileURL& url) const {
+ErrnoOr<PathResolver::Way> PathResolver::wayTo(const FileURL& url) const {
     const char* const path = relative(url);
     if (!path)
-        return std::unexpected(EXDEV);
+        return Errno(EXDEV);
     MountFence* const fence = fences_.around(path);
     const std::string_view whole(path);
     const std::size_t own = fence ? fence->ownBytes(whole) : whole.size();
@@ -109,8 +109,8 @@ std::expected<PathResolver::Way, int> PathResolver::wayTo(const FileURL& url) co
         return Way{.fence = {}, .base = root_.descriptor(), .path = path, .mounts = Mounts::crossed};
     OpenResult base = fence->open(std::string(whole.substr(0, own)).c_str(), O_PATH | O_DIRECTORY);
     if (!base) {
-        noteLeft(url, base.error());
-        return std::unexpected(base.error());
+        noteLeft(url, base.error().number());
+        return base.error();
     }
     const int descriptor = base->get();
     const std::string_view rest = whole.substr(own);

@@ -13,6 +13,7 @@
 #include "os/FileDescriptor.h"
 #include "os/SystemRoot.h"
 #include "platform/Disk.h"
+#include "platform/Errno.h"
 
 #include <cstdint>
 #include <functional>
@@ -42,7 +43,7 @@ struct DirectoryId {
     bool operator==(const DirectoryId&) const = default;
 };
 /// Asks no server that keeps the file system. An errno.
-[[nodiscard]] std::expected<DirectoryId, int> directoryIdOf(int directory);
+[[nodiscard]] ErrnoOr<DirectoryId> directoryIdOf(int directory);
 
 class PathResolver {
 public:
@@ -64,7 +65,7 @@ public:
     [[nodiscard]] OpenResult openDirectoryPath(const FileURL& url) const;
     /// With any flags; a link in the last place fails with ELOOP.
     [[nodiscard]] OpenResult openItem(const FileURL& url, int flags) const;
-    [[nodiscard]] std::expected<ParentAndName, int> openParent(const FileURL& url) const;
+    [[nodiscard]] ErrnoOr<ParentAndName> openParent(const FileURL& url) const;
     /// lstat: 0 or an errno.
     [[nodiscard]] int status(const FileURL& url, struct stat& status) const;
     /// The beginning of a path for a caller that makes its missing parts: at its fence, which has to be there, or at
@@ -75,7 +76,7 @@ public:
         std::string path; ///< relative to `base`
         Mounts mounts = Mounts::left;
     };
-    [[nodiscard]] std::expected<Way, int> wayTo(const FileURL& url) const;
+    [[nodiscard]] ErrnoOr<Way> wayTo(const FileURL& url) const;
     /// The path relative to the root ("." for the root itself); nullptr when it lies outside.
     [[nodiscard]] const char* relative(const FileURL& url) const;
 

@@ -150,7 +150,7 @@ int Copier::beginDirectory(const WalkEntry& entry) {
         return made;
     auto directory = platform::openBeneathOnMount(parent, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!directory)
-        return -directory.error();
+        return -directory.error().number();
     return enter(std::move(*directory), entry);
 }
 
@@ -197,7 +197,7 @@ int Copier::copyFile(const WalkEntry& entry) {
     constexpr int flags = O_RDONLY | O_NONBLOCK | O_NOCTTY | O_NOFOLLOW;
     const auto source = platform::openBeneathOnMount(entry.parent, entry.name, flags);
     if (!source)
-        return source.error() == ENOENT && entry.depth > 0 ? 0 : -source.error();
+        return source.error() == ENOENT && entry.depth > 0 ? 0 : -source.error().number();
     struct stat status{};
     if (::fstat(source->get(), &status) != 0)
         return -errno;
@@ -302,7 +302,7 @@ int Copier::openLinks() {
     auto directory =
         platform::openBeneathOnMount(destination_.root(), linksName_.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!directory)
-        return -directory.error();
+        return -directory.error().number();
     links_ = std::move(*directory);
     return 0;
 }

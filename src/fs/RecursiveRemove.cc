@@ -186,7 +186,7 @@ int clearImmutable(platform::Disk& disk, int directory, const char* name) {
         return 0;
     const auto item = platform::openBeneathOnMount(directory, name, O_RDONLY | O_NONBLOCK | O_NOCTTY | O_NOFOLLOW);
     if (!item)
-        return -item.error();
+        return -item.error().number();
     if (::fstat(item->get(), &status) != 0)
         return -errno;
     if (!S_ISREG(status.st_mode) && !S_ISDIR(status.st_mode))

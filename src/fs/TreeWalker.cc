@@ -94,7 +94,7 @@ WalkStep TreeWalker::visitName(WalkEntry entry, unsigned char type) {
         auto directory = platform::openBeneathOnMount(entry.parent, entry.name, directoryFlags);
         if (directory)
             return visitDirectory(entry, std::move(*directory));
-        const int error = directory.error();
+        const int error = directory.error().number();
         if ((error != ENOTDIR && error != ELOOP && error != ENOENT) || change == changesMax)
             return visitUnopened(entry, error);
         if (error == ENOENT && entry.depth > 0)

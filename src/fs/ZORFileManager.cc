@@ -32,7 +32,7 @@ int statusBelow(int base, const std::string& relativePath, Mounts mounts, struct
     const std::string above = slash == relativePath.npos ? "." : relativePath.substr(0, slash);
     const auto parent = fs::openBelow(base, above.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW, mounts);
     if (!parent)
-        return parent.error();
+        return parent.error().number();
     const char* const name = relativePath.c_str() + (slash == relativePath.npos ? 0 : slash + 1);
     const int error = fs::statusOfName(parent->get(), name, status);
     return error == EXDEV && mounts == Mounts::crossed ? 0 : error;
@@ -92,7 +92,7 @@ Result<FileDescriptor> ZORFileManager::openOrCreate(const Base& base, const std:
         struct stat status{};
         const bool misshapen = existing.error() == ELOOP || existing.error() == ENOTDIR;
         const int failure =
-            misshapen ? statusBelow(base.directory, relativePath, base.mounts, status) : existing.error();
+            misshapen ? statusBelow(base.directory, relativePath, base.mounts, status) : existing.error().number();
         if (failure != 0)
             return posixError(here, failure, "Failed to determine if %s exists: %s", url.c_str(), errorText(failure));
         // It is there: a link, or a file.
@@ -174,7 +174,7 @@ Result<FileDescriptor> ZORFileManager::makeNewDirectory(const Base& base, std::s
                           parentUrl.c_str(), above.st_uid);
     const std::string finalName(url.lastPathComponent());
     std::string name;
-    int made = parent ? -EEXIST : -parent.error();
+    int made = parent ? -EEXIST : -parent.error().number();
     for (int tried = 0; parent && made == -EEXIST && tried < namesTriedMax; ++tried) {
         name = uniqueName(finalName + ".");
         made = disk_.makeDirectory(parent->get(), name.c_str(), closedMode);
@@ -234,7 +234,7 @@ int ZORFileManager::setClassAtCreation(int directory, int protectionClass) {
     const auto current = protection_.classOf(directory);
     if (current && *current == protectionClass)
         return 0;
-    const int failure = protection_.setClass(directory, protectionClass);
+    const int failure = protection_.setClass(directory, protectionClass).number();
     if (failure != ENOTSUP)
         return failure;
     if (!saidClassesUnsupported_.exchange(true))
@@ -246,7 +246,7 @@ int ZORFileManager::setClassAtCreation(int directory, int protectionClass) {
 Result<FileURL> ZORFileManager::createTemporaryDirectoryInDirectoryURL(const FileURL& directory) {
     const auto parent = resolver_.openDirectoryPath(directory);
     std::string name;
-    int made = parent ? -EEXIST : -parent.error();
+    int made = parent ? -EEXIST : -parent.error().number();
     for (int tried = 0; parent && made == -EEXIST && tried < namesTriedMax; ++tried) {
         name = uniqueName("temp.");
         made = disk_.makeDirectory(parent->get(), name.c_str(), closedMode);
@@ -284,7 +284,7 @@ bool ZORFileManager::itemIsGone(const FileURL& url) const {
 
 bool ZORFileManager::itemDoesNotExistBelow(int directory, const char* relativePath, const FileURL& url) {
     const auto item = openBeneathOnMount(directory, relativePath, O_PATH | O_NOFOLLOW);
-    int failure = item ? 0 : item.error();
+    int failure = item ? 0 : item.error().number();
     const std::string_view path = relativePath;
     if (failure == ENOENT &&
         fs::hidesNamesBelow(disk_, directory, path.contains('/') ? std::string(path, 0, path.rfind('/')).c_str() : "."))
@@ -329,7 +329,7 @@ Result<void> ZORFileManager::setDataProtectionClassOfEntry(
         return {};
     struct stat status{};
     if (!item || ::fstat(item->get(), &status) != 0) {
-        const int number = platform::neverLocked(item ? errno : item.error());
+        const Errno number = platform::neverLocked(item ? Errno::last() : item.error());
         return posixError(ZOR_HERE, number, "Failed to open %s : %s", ZOR_SHOWN(path), errorText(number));
     }
     if (!S_ISREG(status.st_mode))
@@ -348,7 +348,7 @@ Result<void> ZORFileManager::setClassOf(int fd, const std::string& path, int pro
         if (!predicate(*current))
             return {};
     }
-    if (const int failure = protection_.setClass(fd, protectionClass))
+    if (const Errno failure = protection_.setClass(fd, protectionClass))
         return posixError(here, failure, "Failed to setclass(%d) on file %s: %s", protectionClass, ZOR_SHOWN(path),
                           errorText(failure));
     return {};

@@ -131,7 +131,7 @@ Result<void> ZORFileManager::_copyItemAtURL(const FileURL& source, const FileURL
     const auto from = resolver_.openParent(source);
     const auto to = resolver_.openParent(destination);
     if (!from || !to) {
-        const int number = from ? to.error() : from.error();
+        const int number = from ? to.error().number() : from.error().number();
         return posixError({"copyTree", __LINE__}, number, "clonetree of %s to %s failed: %s", source.c_str(),
                           destination.c_str(), errorText(number));
     }
@@ -149,7 +149,7 @@ Result<void> ZORFileManager::copyTree(int fromDirectory, const FileURL& source, 
     // Nothing of a copy may be missing once it has its name, whatever the power does.
     if (status == 0) {
         const auto copied = platform::openBeneath(toDirectory, ".", O_RDONLY | O_DIRECTORY);
-        status = copied ? disk_.syncFileSystem(copied->get()) : -copied.error();
+        status = copied ? disk_.syncFileSystem(copied->get()) : -copied.error().number();
     }
     if (status == 0)
         status = disk_.rename(toDirectory, hidden.c_str(), toDirectory,
@@ -208,7 +208,7 @@ Result<void> ZORFileManager::moveAcrossFileSystems(int fromDirectory, const File
 int ZORFileManager::removeMovedSource(int fromDirectory, const FileURL& source, int toDirectory, const GoOn& goOn) {
     const auto synced = [this](int directory) {
         const auto listing = platform::openBeneath(directory, ".", O_RDONLY | O_DIRECTORY); // it may be O_PATH
-        return listing ? disk_.sync(listing->get()) : -listing.error();
+        return listing ? disk_.sync(listing->get()) : -listing.error().number();
     };
     const std::string hidden = fs::uniqueName(fs::copyPrefix);
     // The source leaves its name in one step, when the copy cannot lose its own any more; only then it is taken apart.
@@ -263,7 +263,7 @@ void ZORFileManager::standardizeEntry(int parent, const char* name, int director
     if (directory < 0) {
         auto item = platform::openBeneathOnMount(parent, name, O_PATH | O_NOFOLLOW);
         if (!item && item.error() != ENOENT)
-            notGiven(item.error());
+            notGiven(item.error().number());
         if (!item)
             return;
         opened = std::move(*item);
@@ -314,7 +314,7 @@ Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t
                    static_cast<unsigned long long>(standard.others - othersSaidMax), url.c_str());
     const auto parent = resolver_.openParent(url);
     struct stat status{};
-    const int failure = parent ? resolver_.status(url, status) : parent.error();
+    const int failure = parent ? resolver_.status(url, status) : parent.error().number();
     if (failure != 0)
         return posixError(ZOR_HERE, failure, "Could not stat %s: %s", url.c_str(), errorText(failure));
     fs::NamesMet again;              // the root's name has been counted
@@ -342,7 +342,7 @@ Result<void> ZORFileManager::forEachItemInDirectoryAtURL(const FileURL& director
                                : opened.error() == ENOENT && fs::hiddenBy(resolver_, disk_, directory);
     if (opened && !hidden)
         return forEachItemIn(opened->get(), directory, leftovers, visitor);
-    const int number = hidden ? ENOKEY : opened.error();
+    const int number = hidden ? ENOKEY : opened.error().number();
     if (number != ENOENT)
         log_.write(logLevelError, "_IterateDirectory", "opendir of %s failed: %s", directory.c_str(),
                    errorText(number));

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "identity/LinuxPasswordDatabase.h"
 
+#include "base/Try.h"
 #include "os/Names.h"
 #include "os/Openat2.h"
 
@@ -45,59 +46,59 @@ PasswordEntry named(const passwd& found) {
     return {.name = found.pw_name, .uid = found.pw_uid, .homeDirectory = found.pw_dir ? found.pw_dir : ""};
 }
 
-/// Hands over each entry until `visit` wants no more. ENOENT when that never came, any other errno when the file cannot
+/// Hands over each entry until `visit` wants no more. ENOENT when that never came, any other error when the file cannot
 /// be read.
-int visitEntries(std::FILE* file, const std::function<bool(PasswordEntry)>& visit) {
+Errno visitEntries(std::FILE* file, const std::function<bool(PasswordEntry)>& visit) {
     const auto buffer = std::make_unique_for_overwrite<char[]>(entryBytesMax);
     passwd entry{};
     passwd* found = nullptr;
     int error = 0;
     while ((error = ::fgetpwent_r(file, &entry, buffer.get(), entryBytesMax, &found)) == 0) {
         if (!visit(named(*found)))
-            return 0;
+            return Errno();
     }
     // A line longer than the buffer ends the search: no entry is that long, and behind it nothing can be trusted.
-    return error == ERANGE ? ENOENT : error;
+    return Errno(error == ERANGE ? ENOENT : error);
 }
 
 /// Calls a getpw*_r function with a buffer that grows until the entry fits, and hands the entry on.
 template <typename Lookup, typename Convert>
-std::expected<PasswordEntry, int> lookUp(Lookup lookup, Convert convert) {
+ErrnoOr<PasswordEntry> lookUp(Lookup lookup, Convert convert) {
     std::vector<char> buffer(entryBytesFirst);
     for (;;) {
         passwd entry{};
         passwd* found = nullptr;
         const int error = lookup(&entry, buffer.data(), buffer.size(), &found);
         if (error == 0)
-            return found ? convert(named(*found)) : std::unexpected(ENOENT);
+            return found ? convert(named(*found)) : Errno(ENOENT);
         if (error == EINTR)
             continue;
         if (error != ERANGE || buffer.size() >= entryBytesMax)
-            return std::unexpected(error);
+            return Errno(error);
         buffer.resize(buffer.size() * 2);
     }
 }
 
 } // namespace
 
-std::expected<PasswordEntry, int> LinuxPasswordDatabase::entryForUserId(std::uint32_t uid) const {
+ErrnoOr<PasswordEntry> LinuxPasswordDatabase::entryForUserId(std::uint32_t uid) const {
     if (!root_.isDeviceRoot())
         return findInFile([uid](const PasswordEntry& entry) { return entry.uid == uid; });
     return lookUp([uid](auto... rest) { return ::getpwuid_r(uid, rest...); },
                   [this](PasswordEntry found) { return entryOf(std::move(found)); });
 }
 
-std::expected<PasswordEntry, int> LinuxPasswordDatabase::entryForName(std::string_view name) const {
+ErrnoOr<PasswordEntry> LinuxPasswordDatabase::entryForName(std::string_view name) const {
     if (!root_.isDeviceRoot())
         return findInFile([name](const PasswordEntry& entry) { return entry.name == name; });
     return lookUp([text = std::string(name)](auto... rest) { return ::getpwnam_r(text.c_str(), rest...); },
                   [this](PasswordEntry found) { return entryOf(std::move(found)); });
 }
 
-std::expected<LinuxPasswordDatabase::Stamp, int> LinuxPasswordDatabase::stampOf(int file) {
+ErrnoOr<LinuxPasswordDatabase::Stamp> LinuxPasswordDatabase::stampOf(int file) {
     struct stat status{};
     if (::fstat(file, &status) != 0)
-        return std::unexpected(errno);
+        return Errno::last();
     return Stamp{.device = status.st_dev,
                  .inode = status.st_ino,
                  .bytes = status.st_size,
@@ -105,44 +106,42 @@ std::expected<LinuxPasswordDatabase::Stamp, int> LinuxPasswordDatabase::stampOf(
                  .changedNanoseconds = nanoseconds(status.st_ctim)};
 }
 
-std::expected<PasswordEntry, int> LinuxPasswordDatabase::findInFile(const Matches& matches) const {
-    auto opened = openInRoot(root_.descriptor(), names::passwordFile, O_RDONLY | O_NONBLOCK);
-    const auto stamp = opened ? stampOf(opened->get()) : std::unexpected(opened.error());
-    if (!stamp)
-        return std::unexpected(stamp.error());
+ErrnoOr<PasswordEntry> LinuxPasswordDatabase::findInFile(const Matches& matches) const {
+    FileDescriptor opened = TRY(openInRoot(root_.descriptor(), names::passwordFile, O_RDONLY | O_NONBLOCK));
+    const Stamp stamp = TRY(stampOf(opened.get()));
     std::shared_ptr<const Content> content;
     {
         const MutexLock held(mutex_);
         content = content_;
     }
-    int end = ENOENT;
-    if (!content || content->stamp != *stamp) {
-        const bool settled = isSettled(stamp->changedNanoseconds);
-        const std::unique_ptr<std::FILE, FileCloser> file(::fdopen(opened->get(), "re"));
+    Errno end(ENOENT);
+    if (!content || content->stamp != stamp) {
+        const bool settled = isSettled(stamp.changedNanoseconds);
+        const std::unique_ptr<std::FILE, FileCloser> file(::fdopen(opened.get(), "re"));
         if (!file)
-            return std::unexpected(errno);
-        const int descriptor = opened->release();
-        auto read = std::make_shared<Content>(Content{.stamp = *stamp, .entries = {}});
-        const bool keeps = stamp->bytes <= contentBytesMax;
+            return Errno::last();
+        const int descriptor = opened.release();
+        auto read = std::make_shared<Content>(Content{.stamp = stamp, .entries = {}});
+        const bool keeps = stamp.bytes <= contentBytesMax;
         end = visitEntries(file.get(), [&](PasswordEntry entry) {
             if (!keeps && !matches(entry))
                 return true;
             read->entries.push_back(std::move(entry));
             return keeps;
         });
-        if (keeps && settled && end == ENOENT && stampOf(descriptor) == *stamp) {
+        if (keeps && settled && end == ENOENT && stampOf(descriptor) == stamp) {
             const MutexLock held(mutex_);
             content_ = read;
         }
         content = std::move(read);
     }
     const auto found = std::ranges::find_if(content->entries, matches);
-    return found == content->entries.end() ? std::unexpected(end) : entryOf(*found);
+    return found == content->entries.end() ? end : entryOf(*found);
 }
 
-std::expected<PasswordEntry, int> LinuxPasswordDatabase::entryOf(PasswordEntry named) const {
+ErrnoOr<PasswordEntry> LinuxPasswordDatabase::entryOf(PasswordEntry named) const {
     if (!named.homeDirectory.starts_with('/'))
-        return std::unexpected(ENOENT);
+        return Errno(ENOENT);
     named.homeDirectory = root_.path(named.homeDirectory);
     return named;
 }

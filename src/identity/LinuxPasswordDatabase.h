@@ -8,6 +8,7 @@
 #include "base/Mutex.h"
 #include "os/SystemRoot.h"
 #include "platform/Device.h"
+#include "platform/Errno.h"
 
 #include <cstdint>
 #include <functional>
@@ -20,8 +21,8 @@ namespace zor::platform {
 class LinuxPasswordDatabase final : public PasswordDatabase {
 public:
     explicit LinuxPasswordDatabase(const SystemRoot& root) : root_(root) {}
-    [[nodiscard]] std::expected<PasswordEntry, int> entryForUserId(std::uint32_t uid) const override;
-    [[nodiscard]] std::expected<PasswordEntry, int> entryForName(std::string_view name) const override;
+    [[nodiscard]] ErrnoOr<PasswordEntry> entryForUserId(std::uint32_t uid) const override;
+    [[nodiscard]] ErrnoOr<PasswordEntry> entryForName(std::string_view name) const override;
 
 private:
     /// Tells one content of the file from another.
@@ -40,10 +41,10 @@ private:
     };
     using Matches = std::function<bool(const PasswordEntry&)>;
 
-    [[nodiscard]] static std::expected<Stamp, int> stampOf(int file);
-    [[nodiscard]] std::expected<PasswordEntry, int> findInFile(const Matches& matches) const ZOR_EXCLUDES(mutex_);
+    [[nodiscard]] static ErrnoOr<Stamp> stampOf(int file);
+    [[nodiscard]] ErrnoOr<PasswordEntry> findInFile(const Matches& matches) const ZOR_EXCLUDES(mutex_);
     /// `named`, with its home below the root; ENOENT when that is no absolute path.
-    [[nodiscard]] std::expected<PasswordEntry, int> entryOf(PasswordEntry named) const;
+    [[nodiscard]] ErrnoOr<PasswordEntry> entryOf(PasswordEntry named) const;
 
     const SystemRoot& root_;
     mutable Mutex mutex_;

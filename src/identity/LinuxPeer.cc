@@ -1,14 +1,13 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "identity/LinuxPeer.h"
 
-#include "base/ErrorCode.h"
+#include "base/Try.h"
 #include "identity/LinuxPeerIdentity.h"
 #include "os/CoarseClock.h"
 #include "os/Openat2.h"
 
 #include <cerrno>
 #include <climits>
-#include <cstring>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
@@ -23,10 +22,10 @@ constexpr const char* executableLink = "exe";
 /// A peer pays for a look at its executable, some microseconds, at most once in this time.
 constexpr std::int64_t examineEveryMilliseconds = 20;
 
-std::string whyUnexamined(int error) {
+std::string whyUnexamined(Errno error) {
     if (error == ESRCH || error == ENOENT || error == EBADF)
         return "the process has ended";
-    return std::string("the executable cannot be examined: ") + ::strerrordesc_np(error);
+    return std::string("the executable cannot be examined: ") + error.text();
 }
 
 } // namespace
@@ -73,13 +72,13 @@ Identity LinuxPeer::identify(Explain explain) {
     return identity;
 }
 
-std::expected<LinuxPeer::Executable, int> LinuxPeer::executableOf(int process) {
+ErrnoOr<LinuxPeer::Executable> LinuxPeer::executableOf(int process) {
     struct statx status{};
     // The link is one of the kernel's: following it leads to the file that runs, whatever its name is or was. What
     // tells it apart never changes, so a file system that a server keeps, maybe the peer's own, need not be asked.
     if (::statx(process, executableLink, AT_STATX_DONT_SYNC, STATX_INO | STATX_MODE | STATX_UID | STATX_GID, &status) !=
         0)
-        return std::unexpected(errno);
+        return Errno::last();
     return Executable{.id = {.device = makedev(status.stx_dev_major, status.stx_dev_minor), .inode = status.stx_ino},
                       .givesUser = (status.stx_mode & S_ISUID) != 0,
                       .givesGroup = (status.stx_mode & S_ISGID) != 0,
@@ -115,8 +114,7 @@ LinuxPeer::Judgement LinuxPeer::judge(const IdentityRegistry::Snapshot& snapshot
         if (!reason) {
             // No entry after it counts either: this may be the one.
             judgement.decided = false;
-            judgement.explanation +=
-                std::string("the process cannot be examined: ") + ::strerrordesc_np(reason.error());
+            judgement.explanation += std::string("the process cannot be examined: ") + reason.error().text();
             return judgement;
         }
         judgement.explanation += reason->empty() ? "matches" : *reason;
@@ -130,16 +128,14 @@ LinuxPeer::Judgement LinuxPeer::judge(const IdentityRegistry::Snapshot& snapshot
     return judgement;
 }
 
-std::expected<std::string, int> LinuxPeer::mismatch(const RegistryEntry& entry) const {
+ErrnoOr<std::string> LinuxPeer::mismatch(const RegistryEntry& entry) const {
     if (!entry.admitsUser(accepted_.reportedUserId))
         return "uid " + std::to_string(accepted_.reportedUserId) +
                (entry.userIds ? " is not one of its UserIDs" : " is not 0, and it names no UserIDs");
     if (entry.unit) {
-        const auto actual = unit();
-        if (!actual)
-            return std::unexpected(actual.error());
-        if (*actual != *entry.unit)
-            return "the process is in unit \"" + *actual + "\", not in \"" + *entry.unit + "\"";
+        const std::string actual = TRY(unit());
+        if (actual != *entry.unit)
+            return "the process is in unit \"" + actual + "\", not in \"" + *entry.unit + "\"";
     }
     if (entry.securityLabel && !accepted_.securityLabel)
         return "the kernel gives no security label";
@@ -148,11 +144,11 @@ std::expected<std::string, int> LinuxPeer::mismatch(const RegistryEntry& entry) 
     return std::string();
 }
 
-std::expected<std::string, int> LinuxPeer::unit() const {
+ErrnoOr<std::string> LinuxPeer::unit() const {
     const FileDescriptor file(::openat(accepted_.process.get(), "cgroup", O_RDONLY | O_CLOEXEC));
-    const auto text = file.valid() ? readSmallFile(file.get(), cgroupBytesMax) : std::unexpected(errno);
+    const auto text = file.valid() ? readSmallFile(file.get(), cgroupBytesMax) : Errno::last();
     if (!text && isOwnShortage(text.error()))
-        return std::unexpected(text.error());
+        return text.error();
     return text ? systemUnitInCgroups(*text) : std::string();
 }
 

@@ -20,6 +20,7 @@
 #include "identity/AddressSpace.h"
 #include "identity/IdentityRegistry.h"
 #include "os/FileDescriptor.h"
+#include "platform/Errno.h"
 #include "platform/PeerIdentity.h"
 
 #include <memory>
@@ -38,8 +39,8 @@ public:
         uid_t uid = 0;
         gid_t gid = 0;
     };
-    /// The program that a process runs, by its /proc directory; or the errno of the look.
-    [[nodiscard]] static std::expected<Executable, int> executableOf(int process);
+    /// The program that a process runs, by its /proc directory; or the error of the look.
+    [[nodiscard]] static ErrnoOr<Executable> executableOf(int process);
 
     /// The kernel's words when the connection was accepted.
     struct Accepted {
@@ -75,11 +76,11 @@ private:
         std::string explanation;
     };
     [[nodiscard]] Judgement judge(const IdentityRegistry::Snapshot& snapshot, const FileId& executable) const;
-    /// In words, what keeps the peer from being the one that the entry means; empty: nothing does. An errno when there
+    /// In words, what keeps the peer from being the one that the entry means; empty: nothing does. An error when there
     /// was no descriptor or no memory to look.
-    [[nodiscard]] std::expected<std::string, int> mismatch(const RegistryEntry& entry) const;
-    /// Empty when it is in none; the same errnos.
-    [[nodiscard]] std::expected<std::string, int> unit() const;
+    [[nodiscard]] ErrnoOr<std::string> mismatch(const RegistryEntry& entry) const;
+    /// Empty when it is in none; the same errors.
+    [[nodiscard]] ErrnoOr<std::string> unit() const;
     [[nodiscard]] std::string executableName() const;
 
     const Accepted accepted_;

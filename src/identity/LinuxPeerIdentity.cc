@@ -1,13 +1,12 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "identity/LinuxPeerIdentity.h"
 
-#include "base/ErrorCode.h"
+#include "base/Try.h"
 #include "identity/LinuxPeer.h"
 #include "os/Openat2.h"
 
 #include <cerrno>
 #include <charconv>
-#include <expected>
 #include <fcntl.h>
 #include <poll.h>
 #include <string>
@@ -84,10 +83,8 @@ FileDescriptor processOfPeer(int socket, pid_t pid) {
     return FileDescriptor(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)));
 }
 
-std::expected<FileDescriptor, int> unlessShortage(int error) {
-    if (isOwnShortage(error))
-        return std::unexpected(error);
-    return FileDescriptor();
+ErrnoOr<FileDescriptor> unlessShortage(Errno error) {
+    return isOwnShortage(error) ? ErrnoOr<FileDescriptor>(error) : FileDescriptor();
 }
 
 bool hasEnded(int pidfd) {
@@ -99,29 +96,27 @@ bool hasEnded(int pidfd) {
     return count != 0;
 }
 
-/// Which number /proc gives the process: what it has in the namespace that /proc belongs to. An errno when that cannot
+/// Which number /proc gives the process: what it has in the namespace that /proc belongs to. An error when that cannot
 /// be told.
-std::expected<pid_t, int> numberInProc(int pidfd) {
+ErrnoOr<pid_t> numberInProc(int pidfd) {
     const std::string path = "/proc/self/fdinfo/" + std::to_string(pidfd);
     const FileDescriptor file(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-    const auto text = file.valid() ? readSmallFile(file.get(), fdinfoBytesMax) : std::unexpected(errno);
-    if (!text)
-        return std::unexpected(text.error());
+    const std::string text = TRY(file.valid() ? readSmallFile(file.get(), fdinfoBytesMax) : Errno::last());
     constexpr std::string_view field = "\nPid:\t";
-    const std::size_t at = text->find(field);
+    const std::size_t at = text.find(field);
     pid_t number = 0;
     if (at != std::string::npos)
-        (void)std::from_chars(text->data() + at + field.size(), text->data() + text->size(), number);
+        (void)std::from_chars(text.data() + at + field.size(), text.data() + text.size(), number);
     return number;
 }
 
 /// /proc/PID of the peer. It was the peer's when it was opened if the peer was alive afterwards; from then on the
-/// descriptor belongs to that process alone. Invalid when the peer has ended; an errno when there was no descriptor or
+/// descriptor belongs to that process alone. Invalid when the peer has ended; an error when there was no descriptor or
 /// no memory to look: a living peer would be nobody for as long as it is connected.
-std::expected<FileDescriptor, int> pinProcess(int socket, pid_t pid) {
+ErrnoOr<FileDescriptor> pinProcess(int socket, pid_t pid) {
     const FileDescriptor process = processOfPeer(socket, pid);
     if (!process.valid())
-        return unlessShortage(errno);
+        return unlessShortage(Errno::last());
     // Another /proc may have been mounted there since the start: its number for this process would be another's.
     const auto number = numberInProc(process.get());
     if (!number)
@@ -131,7 +126,7 @@ std::expected<FileDescriptor, int> pinProcess(int socket, pid_t pid) {
     const std::string path = "/proc/" + std::to_string(pid);
     FileDescriptor directory(::open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
     if (!directory.valid())
-        return unlessShortage(errno);
+        return unlessShortage(Errno::last());
     if (hasEnded(process.get()))
         directory.reset();
     return directory;
@@ -176,7 +171,7 @@ std::unique_ptr<Peer> LinuxPeerIdentity::peerOfSocket(int socket) {
     }
     auto process = pinProcess(socket, credentials.pid);
     if (!process) {
-        errno = process.error();
+        errno = process.error().number();
         return nullptr;
     }
     AddressSpace addressSpace;
@@ -185,7 +180,7 @@ std::unique_ptr<Peer> LinuxPeerIdentity::peerOfSocket(int socket) {
         addressSpace = AddressSpace::of(process->get());
         const auto now = LinuxPeer::executableOf(process->get());
         if (!now && isOwnShortage(now.error())) {
-            errno = now.error();
+            errno = now.error().number();
             return nullptr;
         }
         if (now)

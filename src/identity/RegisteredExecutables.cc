@@ -40,7 +40,7 @@ std::string resolved(const std::string& path) {
 void watchNameAt(const std::string& path, int inotify, std::uint32_t events, RegisteredExecutables::Found& watched) {
     const std::size_t slash = path.rfind('/');
     const FileDescriptor parent(::open(path.substr(0, slash + 1).c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-    const auto number = parent.valid() ? watchDirectory(inotify, parent.get(), events) : std::unexpected(errno);
+    const auto number = parent.valid() ? watchDirectory(inotify, parent.get(), events) : Errno::last();
     if (number)
         watched.watches.push_back({.number = *number, .name = path.substr(slash + 1)});
     else

@@ -1,12 +1,11 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "identity/RegistryDirectory.h"
 
-#include "base/ErrorCode.h"
+#include "base/Try.h"
 #include "os/Names.h"
 #include "os/Openat2.h"
 
 #include <cerrno>
-#include <cstring>
 #include <fcntl.h>
 
 namespace zor::platform {
@@ -17,9 +16,8 @@ std::int64_t nanosecondsOf(const timespec& time) {
     return std::int64_t{time.tv_sec} * 1'000'000'000 + time.tv_nsec;
 }
 
-RegistryProblem cannot(const char* what, int error) {
-    return {.text = std::string("cannot be ") + what + ": " + ::strerrordesc_np(error),
-            .isShortage = isOwnShortage(error)};
+RegistryProblem cannot(const char* what, Errno error) {
+    return {.text = std::string("cannot be ") + what + ": " + error.text(), .isShortage = isOwnShortage(error)};
 }
 
 bool isRegistryName(std::string_view name) {
@@ -81,7 +79,7 @@ std::expected<std::string, RegistryProblem> RegistryDirectory::bytes(const Regis
         return std::unexpected(cannot("opened", file.error()));
     struct stat status{};
     if (::fstat(file->get(), &status) != 0)
-        return std::unexpected(cannot("examined", errno));
+        return std::unexpected(cannot("examined", Errno::last()));
     if (!S_ISREG(status.st_mode))
         return std::unexpected(RegistryProblem{.text = "is no regular file"});
     if (auto problem = ownershipProblem(status))
@@ -94,10 +92,8 @@ std::expected<std::string, RegistryProblem> RegistryDirectory::bytes(const Regis
 
 std::expected<RegistryEntry, RegistryProblem> RegistryDirectory::read(const RegistryListing& listing,
                                                                       const std::string& name) const {
-    const auto content = bytes(listing, name);
-    if (!content)
-        return std::unexpected(content.error());
-    auto parsed = parseIdentityFile({reinterpret_cast<const std::uint8_t*>(content->data()), content->size()});
+    const std::string content = TRY(bytes(listing, name));
+    auto parsed = parseIdentityFile({reinterpret_cast<const std::uint8_t*>(content.data()), content.size()});
     if (!parsed)
         return std::unexpected(RegistryProblem{.text = std::move(parsed.error())});
     return std::move(*parsed);

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "identity/UserConfiguration.h"
 
+#include "base/Try.h"
 #include "identity/LinuxPasswordDatabase.h"
 #include "os/FileDescriptor.h"
 #include "os/Names.h"
@@ -8,7 +9,6 @@
 
 #include <cerrno>
 #include <charconv>
-#include <cstring>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -37,22 +37,21 @@ std::expected<std::string, std::string> readConfiguration(const SystemRoot& root
     if (!file && file.error() == ENOENT)
         return "";
     struct stat status{};
-    const int error = !file ? file.error() : ::fstat(file->get(), &status) != 0 ? errno : 0;
-    if (error != 0)
-        return std::unexpected(std::string("cannot be opened: ") + ::strerrordesc_np(error));
+    const Errno error = !file ? file.error() : ::fstat(file->get(), &status) != 0 ? Errno::last() : Errno();
+    if (error)
+        return std::unexpected(std::string("cannot be opened: ") + error.text());
     const bool isTrusted = status.st_uid == 0 || status.st_uid == ::geteuid();
     if (!isTrusted || (status.st_mode & (S_IWGRP | S_IWOTH)) != 0)
         return std::unexpected("can be written by others; give it to root and run chmod go-w on it");
     auto text = readSmallFile(file->get(), fileBytesMax);
     if (!text)
-        return std::unexpected(std::string("cannot be read: ") + ::strerrordesc_np(text.error()));
+        return std::unexpected(std::string("cannot be read: ") + text.error().text());
     return std::move(*text);
 }
 
-std::expected<ipc::Account, int> accountOf(const std::expected<PasswordEntry, int>& entry) {
-    if (!entry)
-        return std::unexpected(entry.error());
-    return ipc::Account{.name = entry->name, .number = entry->uid};
+ErrnoOr<ipc::Account> accountOf(const ErrnoOr<PasswordEntry>& found) {
+    const PasswordEntry entry = TRY(found);
+    return ipc::Account{.name = entry.name, .number = entry.uid};
 }
 
 } // namespace

@@ -4,7 +4,6 @@
 #include <array>
 #include <cerrno>
 #include <charconv>
-#include <cstring>
 #include <optional>
 
 namespace zor::ipc {
@@ -86,8 +85,8 @@ std::expected<std::uint32_t, std::string> numberOf(const Setting& setting, bool 
         if (!account)
             return wrong(setting, account.error() == ENOENT
                                       ? "there is no such account; make it, or write a number"
-                                      : std::string("the account cannot be looked up (") +
-                                            ::strerrordesc_np(account.error()) + "); start again when it can");
+                                      : std::string("the account cannot be looked up (") + account.error().text() +
+                                            "); start again when it can");
         number = account->number;
     }
     if (number <= currentMobileUser || number > UserNumbers::configuredMax)

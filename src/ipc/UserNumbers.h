@@ -6,6 +6,7 @@
 #pragma once
 
 #include "ipc/ContainerClasses.h"
+#include "platform/Errno.h"
 
 #include <algorithm>
 #include <cstdint>
@@ -67,10 +68,10 @@ struct Account {
 inline constexpr std::string_view installerAccount = "zorvane-installer";
 inline constexpr std::string_view systemAccount = "zorvane-system";
 
-/// The accounts of the root. Either returns nothing where there is none.
+/// The accounts of the root. ENOENT where there is none.
 struct Accounts {
-    std::function<std::expected<Account, int>(std::string_view name)> named;
-    std::function<std::expected<Account, int>(std::uint32_t number)> numbered;
+    std::function<ErrnoOr<Account>(std::string_view name)> named;
+    std::function<ErrnoOr<Account>(std::uint32_t number)> numbered;
 };
 
 struct ConfiguredUsers {

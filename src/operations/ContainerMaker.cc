@@ -80,13 +80,13 @@ ZORError ContainerBuilder::subdirectoryError(Here here, const char* subdirectory
 Result<void> ContainerBuilder::_createTopLevelContainerDirectory() {
     auto parent = fileManager_.resolver().openParent(staging_);
     if (!parent)
-        return topLevelError(ZOR_HERE, parent.error(), "open of the parent");
+        return topLevelError(ZOR_HERE, parent.error().number(), "open of the parent");
     const char* name = parent->name.c_str();
     if (const int made = disk_.makeDirectory(parent->directory.get(), name, closedMode); made < 0)
         return topLevelError(ZOR_HERE, -made, "mkdir");
     auto directory = openBeneath(parent->directory.get(), name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!directory)
-        return topLevelError(ZOR_HERE, directory.error(), "opendir");
+        return topLevelError(ZOR_HERE, directory.error().number(), "opendir");
     directory_ = std::move(*directory);
     if (const int failed = fileManager_.setClassAtCreation(directory_.get(), layout_.topLevelProtectionClass))
         return topLevelError(ZOR_HERE, failed, "setclass");
@@ -111,7 +111,7 @@ Result<void> ContainerBuilder::_createSubDirectories() {
             return subdirectoryError(ZOR_HERE, subdirectory, -made, "mkdir");
         auto opened = openBeneath(parent, name, O_PATH | O_DIRECTORY | O_NOFOLLOW);
         if (!opened)
-            return subdirectoryError(ZOR_HERE, subdirectory, opened.error(), "opendir");
+            return subdirectoryError(ZOR_HERE, subdirectory, opened.error().number(), "opendir");
         subdirectories_.push_back(std::move(*opened));
     }
     return {};

@@ -82,9 +82,9 @@ Result<DeathRow::Row> DeathRow::condemn(const FileURL& url, const FileURL& desti
     const auto from = needs_.fileManager.resolver().openParent(url);
     const auto to = needs_.fileManager.resolver().openParent(destination);
     if (!from || !to) {
-        const int number = from ? to.error() : from.error();
-        return posixError({moveFunction, __LINE__}, number, "open of %s failed: %s",
-                          (from ? destination : url).deletingLastPathComponent().c_str(), errorText(number));
+        const Errno error = from ? to.error() : from.error();
+        return posixError({moveFunction, __LINE__}, error, "open of %s failed: %s",
+                          (from ? destination : url).deletingLastPathComponent().c_str(), errorText(error));
     }
     if (owner)
         TRY(judgeOwner(from->directory.get(), url, *owner));
@@ -101,9 +101,9 @@ Result<DeathRow::Row> DeathRow::condemn(const FileURL& url, const FileURL& desti
 
 Result<void> DeathRow::condemnOnItsFileSystem(int from, const FileURL& url, std::optional<std::uint32_t> owner) {
     ZORFileManager& fileManager = needs_.fileManager;
-    const auto failed = [&](const FileURL& row, int number) {
-        return posixError({moveFunction, __LINE__}, number, "death row %s cannot be used: %s", row.c_str(),
-                          errorText(number));
+    const auto failed = [&](const FileURL& row, Errno error) {
+        return posixError({moveFunction, __LINE__}, error, "death row %s cannot be used: %s", row.c_str(),
+                          errorText(error));
     };
     const auto top = fs::topOfMount(fileManager.resolver(), url.deletingLastPathComponent());
     if (!top)
@@ -131,8 +131,8 @@ Result<void> DeathRow::judgeOwner(int directory, const FileURL& url, std::uint32
         platform::openBeneathOnMount(directory, std::string(url.lastPathComponent()).c_str(), O_PATH | O_NOFOLLOW);
     struct stat status{};
     if (!item || ::fstat(item->get(), &status) != 0) {
-        const int number = item ? errno : item.error() == EXDEV ? EBUSY : item.error();
-        return posixError({moveFunction, __LINE__}, number, "open of %s failed: %s", url.c_str(), errorText(number));
+        const Errno error = item ? Errno::last() : item.error() == EXDEV ? Errno(EBUSY) : item.error();
+        return posixError({moveFunction, __LINE__}, error, "open of %s failed: %s", url.c_str(), errorText(error));
     }
     // A power cut may have kept a directory that the daemon made and lost who was to own it. An empty one is nobody's
     // loss.

@@ -185,11 +185,11 @@ Result<void> DeathRow::moveToTemporary(const FileURL& url, const FileURL& destin
     const auto item = fileManager.resolver().openDirectory(url);
     const auto from = fileManager.resolver().openParent(url);
     const auto to = fileManager.resolver().openParent(destination);
-    int number = !item ? item.error() : !from ? from.error() : !to ? to.error() : 0;
-    if (number == 0)
-        number = closeAndMark(fileManager.disk(), item->get());
-    if (number != 0)
-        return posixError(ZOR_HERE, number, "closing of %s failed: %s", url.c_str(), errorText(number));
+    Errno error = !item ? item.error() : !from ? from.error() : !to ? to.error() : Errno();
+    if (!error)
+        error = Errno(closeAndMark(fileManager.disk(), item->get()));
+    if (error)
+        return posixError(ZOR_HERE, error, "closing of %s failed: %s", url.c_str(), errorText(error));
     TRY(fileManager.renameItem(from->directory.get(), url, to->directory.get(), destination));
     if (inTemporary_)
         inTemporary_->emplace(destination.lastPathComponent());

@@ -14,7 +14,7 @@ std::optional<ZORError> LastingMoves::syncDirectories(std::vector<FileURL> chang
     const platform::BlockingScope blocking;
     for (const FileURL& url : changed) {
         const auto directory = fileManager_.resolver().openDirectory(url);
-        const int status = directory ? durability_.afterMove(directory->get()) : -directory.error();
+        const int status = directory ? durability_.afterMove(directory->get()) : -directory.error().number();
         if (status < 0)
             return posixError(ZOR_HERE, -status, "sync of %s failed: %s", url.c_str(), errorText(-status));
     }
@@ -25,7 +25,7 @@ int LastingMoves::orderBetween(const FileURL& changed, const FileURL& next) cons
     const auto first = fileManager_.resolver().openDirectory(changed);
     const auto second = fileManager_.resolver().openDirectory(next);
     if (!first || !second)
-        return -(first ? second.error() : first.error());
+        return -(first ? second.error() : first.error()).number();
     return durability_.between(first->get(), second->get());
 }
 

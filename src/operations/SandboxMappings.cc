@@ -15,18 +15,18 @@ bool SandboxMappings::_setSandboxContainerMappingForUser(std::uint32_t userId, c
     const auto type = containerClass == ContainerClass::sharedAppGroup ? platform::SandboxItemType::groupContainer
                                                                        : platform::SandboxItemType::dataContainer;
     const auto typeNumber = static_cast<unsigned long long>(type);
-    if (const int status = sandbox_.setMapping(userId, type, identifier, std::nullopt)) {
+    if (const Errno error = sandbox_.setMapping(userId, type, identifier, std::nullopt)) {
         log_.write(logLevelError, __func__,
                    "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, class: %llu, path: %s : %d",
-                   userId, typeNumber, ZOR_SHOWN(identifier), classNumber, "(null)", status);
+                   userId, typeNumber, ZOR_SHOWN(identifier), classNumber, "(null)", error.number());
         return false;
     }
     if (!url)
         return true;
-    if (const int status = sandbox_.setMapping(userId, type, identifier, url->path())) {
+    if (const Errno error = sandbox_.setMapping(userId, type, identifier, url->path())) {
         log_.write(logLevelError, __func__,
                    "Failed to set mapping for user: %u, itemType: %llu, identifier %s, class: %llu, path: %s : %d",
-                   userId, typeNumber, ZOR_SHOWN(identifier), classNumber, url->c_str(), status);
+                   userId, typeNumber, ZOR_SHOWN(identifier), classNumber, url->c_str(), error.number());
         return false;
     }
     return true;

@@ -26,11 +26,10 @@ bool ReplaceRecovery::mayComeBack(const FileURL& staged, const WaitingReplaces::
     if (!atStake.place.empty() && (atStake.place == waiting.oldUrl || atStake.place == waiting.destUrl))
         return true;
     const auto parent = resolver.openParent(staged);
-    const int failure = parent ? 0 : parent.error();
     const auto bytes =
         parent ? fs::readOwnedFile(needs_.fileManager.disk(), parent->directory.get(),
                                    (parent->name + "/" + names::metadataFile).c_str(), fs::metadataFileBytesMax)
-               : std::unexpected(failure);
+               : parent.error();
     if (bytes) {
         const auto record = parseMetadata(*bytes, ContainerPlace(staged), atStake.userId, CheckClassPath::no);
         return record && (*record)->containerClass() == atStake.containerClass &&

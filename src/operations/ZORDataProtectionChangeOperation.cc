@@ -179,9 +179,9 @@ Result<platform::FileDescriptor> ZORDataProtectionChangeOperation::openContainer
     auto opened = needs_.fileManager.resolver().openDirectory(dataContainerMetadata_->url());
     struct stat status{};
     if (!opened || ::fstat(opened->get(), &status) != 0) {
-        const int number = platform::neverLocked(opened ? errno : opened.error());
-        return posixError({passFunction, __LINE__}, number, "fts_open failed for %s : %s", shown(items).c_str(),
-                          errorText(number));
+        const Errno error = platform::neverLocked(opened ? Errno::last() : opened.error());
+        return posixError({passFunction, __LINE__}, error, "fts_open failed for %s : %s", shown(items).c_str(),
+                          errorText(error));
     }
     // While the change waited, another one may have come to the same place.
     const auto identity = identityOf(opened->get());

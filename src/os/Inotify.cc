@@ -8,13 +8,11 @@
 
 namespace zor::platform {
 
-std::expected<int, int> watchDirectory(int inotify, int directory, std::uint32_t events) {
+ErrnoOr<int> watchDirectory(int inotify, int directory, std::uint32_t events) {
     char path[32];
     std::snprintf(path, sizeof path, "/proc/self/fd/%d", directory);
     const int watch = ::inotify_add_watch(inotify, path, events | IN_ONLYDIR);
-    if (watch < 0)
-        return std::unexpected(errno);
-    return watch;
+    return watch < 0 ? ErrnoOr<int>(Errno::last()) : watch;
 }
 
 bool readInotify(int inotify, const std::function<bool(const inotify_event&, std::string_view name)>& counts) {

@@ -2,8 +2,9 @@
 // Change notices of directories. Any thread, one reader at a time.
 #pragma once
 
+#include "platform/Errno.h"
+
 #include <cstdint>
-#include <expected>
 #include <functional>
 #include <string_view>
 #include <sys/inotify.h>
@@ -11,7 +12,7 @@
 namespace zor::platform {
 
 /// Watches an open directory, wherever its name points by now. The watch's number, or an errno.
-[[nodiscard]] std::expected<int, int> watchDirectory(int inotify, int directory, std::uint32_t events);
+[[nodiscard]] ErrnoOr<int> watchDirectory(int inotify, int directory, std::uint32_t events);
 
 /// Takes all pending events of a non-blocking inotify descriptor. True when `counts` accepted one of them.
 bool readInotify(int inotify, const std::function<bool(const inotify_event&, std::string_view name)>& counts);

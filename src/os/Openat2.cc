@@ -27,8 +27,7 @@ constexpr int attemptsMax = 128;
 constexpr int attemptsAtOnce = 8;
 constexpr std::chrono::microseconds pause{100};
 
-std::expected<FileDescriptor, int> resolve(int directory, const char* path, int flags, mode_t mode,
-                                           std::uint64_t rules) {
+ErrnoOr<FileDescriptor> resolve(int directory, const char* path, int flags, mode_t mode, std::uint64_t rules) {
     open_how how{};
     how.flags = static_cast<std::uint64_t>(static_cast<unsigned>(flags | O_CLOEXEC));
     how.mode = mode;
@@ -38,20 +37,20 @@ std::expected<FileDescriptor, int> resolve(int directory, const char* path, int 
         if (fd >= 0)
             return FileDescriptor(static_cast<int>(fd));
         if (errno != EINTR && (errno != EAGAIN || attempt >= attemptsMax))
-            return std::unexpected(errno);
+            return Errno::last();
         if (attempt >= attemptsAtOnce)
             std::this_thread::sleep_for(pause);
     }
 }
 
-std::expected<FileDescriptor, int> remembered(int directory, const char* path, int flags, std::uint64_t rules) {
+ErrnoOr<FileDescriptor> remembered(int directory, const char* path, int flags, std::uint64_t rules) {
     open_how how{};
     how.flags = static_cast<std::uint64_t>(static_cast<unsigned>(flags | O_PATH | O_CLOEXEC));
     how.resolve = rules | RESOLVE_CACHED;
     const long fd = ::syscall(SYS_openat2, directory, path, &how, sizeof how);
     if (fd >= 0)
         return FileDescriptor(static_cast<int>(fd));
-    return std::unexpected(errno == EINVAL ? EAGAIN : errno);
+    return errno == EINVAL ? Errno(EAGAIN) : Errno::last();
 }
 
 bool hasParentComponent(std::string_view path) {
@@ -60,52 +59,52 @@ bool hasParentComponent(std::string_view path) {
 
 } // namespace
 
-std::expected<FileDescriptor, int> openBeneath(int directory, const char* relativePath, int flags, mode_t mode) {
+ErrnoOr<FileDescriptor> openBeneath(int directory, const char* relativePath, int flags, mode_t mode) {
     return resolve(directory, relativePath, flags, mode, RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS);
 }
 
-std::expected<FileDescriptor, int> openBeneathOnMount(int directory, const char* relativePath, int flags) {
+ErrnoOr<FileDescriptor> openBeneathOnMount(int directory, const char* relativePath, int flags) {
     // These alone lead out where no link is followed. RESOLVE_BENEATH would find them too, at a tenth of the price of
     // the whole call, which walks of large trees make for every directory.
     if (relativePath[0] == '/' || hasParentComponent(relativePath))
-        return std::unexpected(EXDEV);
+        return Errno(EXDEV);
     return resolve(directory, relativePath, flags, 0, RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS | RESOLVE_NO_XDEV);
 }
 
-std::expected<FileDescriptor, int> openBeneathRemembered(int directory, const char* relativePath, int flags) {
+ErrnoOr<FileDescriptor> openBeneathRemembered(int directory, const char* relativePath, int flags) {
     return remembered(directory, relativePath, flags, RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS);
 }
 
-std::expected<FileDescriptor, int> openRemembered(const char* path) {
+ErrnoOr<FileDescriptor> openRemembered(const char* path) {
     return remembered(AT_FDCWD, path, 0, 0);
 }
 
-std::expected<FileDescriptor, int> openInRoot(int directory, const char* relativePath, int flags) {
+ErrnoOr<FileDescriptor> openInRoot(int directory, const char* relativePath, int flags) {
     return resolve(directory, relativePath, flags, 0, RESOLVE_IN_ROOT | RESOLVE_NO_MAGICLINKS);
 }
 
-std::expected<std::uint64_t, int> mountIdOf(int fd) {
+ErrnoOr<std::uint64_t> mountIdOf(int fd) {
     struct statx status{};
     if (::statx(fd, "", AT_EMPTY_PATH | AT_STATX_DONT_SYNC | AT_NO_AUTOMOUNT, STATX_MNT_ID, &status) != 0)
-        return std::unexpected(errno);
+        return Errno::last();
     if ((status.stx_mask & STATX_MNT_ID) == 0)
-        return std::unexpected(ENOSYS);
+        return Errno(ENOSYS);
     return status.stx_mnt_id;
 }
 
-std::expected<std::string, int> readSmallFile(int fd, std::size_t bytesMax) {
+ErrnoOr<std::string> readSmallFile(int fd, std::size_t bytesMax) {
     struct stat status{};
     if (::fstat(fd, &status) != 0)
-        return std::unexpected(errno);
+        return Errno::last();
     if (!S_ISREG(status.st_mode))
-        return std::unexpected(EINVAL);
+        return Errno(EINVAL);
     // The size is a hint only: files of procfs say 0, and others may grow meanwhile.
     constexpr std::size_t readBytesMin = 512;
     std::string bytes;
     std::size_t filled = 0;
     for (;;) {
         if (filled > bytesMax)
-            return std::unexpected(EFBIG);
+            return Errno(EFBIG);
         if (filled == bytes.size()) {
             const std::size_t hinted = std::max(static_cast<std::size_t>(status.st_size) + 1, readBytesMin);
             bytes.resize(std::min(std::max(hinted, filled * 2), bytesMax + 1));
@@ -114,7 +113,7 @@ std::expected<std::string, int> readSmallFile(int fd, std::size_t bytesMax) {
         if (count < 0 && errno == EINTR)
             continue;
         if (count < 0)
-            return std::unexpected(errno);
+            return Errno::last();
         if (count == 0)
             break;
         filled += static_cast<std::size_t>(count);
@@ -129,18 +128,18 @@ struct DirectoryCloser {
 };
 } // namespace
 
-std::expected<std::vector<std::string>, int> directoryNames(int directory) {
+ErrnoOr<std::vector<std::string>> directoryNames(int directory) {
     std::vector<std::string> names;
     FileDescriptor own(::openat(directory, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     const std::unique_ptr<DIR, DirectoryCloser> stream(own.valid() ? ::fdopendir(own.get()) : nullptr);
     if (!stream)
-        return std::unexpected(errno);
+        return Errno::last();
     (void)own.release();
     for (;;) {
         errno = 0;
         const dirent* const entry = ::readdir(stream.get());
         if (!entry && errno != 0)
-            return std::unexpected(errno);
+            return Errno::last();
         if (!entry)
             break;
         const std::string_view name = entry->d_name;

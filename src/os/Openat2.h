@@ -3,10 +3,10 @@
 #pragma once
 
 #include "os/FileDescriptor.h"
+#include "platform/Errno.h"
 
 #include <cstddef>
 #include <cstdint>
-#include <expected>
 #include <span>
 #include <string>
 #include <sys/types.h>
@@ -19,33 +19,31 @@ namespace zor::platform {
 
 /// Opens `relativePath` below `directory` (RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS; O_CLOEXEC is
 /// added). A link anywhere gives ELOOP (with O_PATH | O_NOFOLLOW a link in the last place too), a step out EXDEV.
-[[nodiscard]] std::expected<FileDescriptor, int> openBeneath(int directory, const char* relativePath, int flags,
-                                                             mode_t mode = 0);
+[[nodiscard]] ErrnoOr<FileDescriptor> openBeneath(int directory, const char* relativePath, int flags, mode_t mode = 0);
 
 /// The same, and no mount point is crossed, not even one of the same file system: EXDEV. What is mounted there is not
 /// asked. A ".." is refused even where it stays inside.
-[[nodiscard]] std::expected<FileDescriptor, int> openBeneathOnMount(int directory, const char* relativePath, int flags);
+[[nodiscard]] ErrnoOr<FileDescriptor> openBeneathOnMount(int directory, const char* relativePath, int flags);
 
 /// The same as openBeneath with O_PATH, out of the kernel's memory of names alone: no file system is asked, so none can
 /// make it wait. EAGAIN, as often as it likes, where one would have to be asked, or where the kernel has no such call.
-[[nodiscard]] std::expected<FileDescriptor, int> openBeneathRemembered(int directory, const char* relativePath,
-                                                                       int flags);
+[[nodiscard]] ErrnoOr<FileDescriptor> openBeneathRemembered(int directory, const char* relativePath, int flags);
 
 /// The same for a whole path, whose links are followed.
-[[nodiscard]] std::expected<FileDescriptor, int> openRemembered(const char* path);
+[[nodiscard]] ErrnoOr<FileDescriptor> openRemembered(const char* path);
 
 /// The same as openBeneath for trees that only root writes to, such as DIR/etc: links are followed, as if `directory`
 /// were "/".
-[[nodiscard]] std::expected<FileDescriptor, int> openInRoot(int directory, const char* relativePath, int flags);
+[[nodiscard]] ErrnoOr<FileDescriptor> openInRoot(int directory, const char* relativePath, int flags);
 
 /// The number of the mount that an open file lies on. Asks its file system nothing; errno on failure.
-[[nodiscard]] std::expected<std::uint64_t, int> mountIdOf(int fd);
+[[nodiscard]] ErrnoOr<std::uint64_t> mountIdOf(int fd);
 
 // Reading a file of bounded size whole. Any thread.
 
 /// Everything from the descriptor's offset on. EFBIG when that is more than `bytesMax`, EINVAL when it is no regular
 /// file.
-[[nodiscard]] std::expected<std::string, int> readSmallFile(int fd, std::size_t bytesMax);
+[[nodiscard]] ErrnoOr<std::string> readSmallFile(int fd, std::size_t bytesMax);
 /// read(2) that no signal ends: the count, or the negative errno.
 [[nodiscard]] ssize_t readOnce(int fd, std::span<std::uint8_t> bytes);
 
@@ -53,7 +51,7 @@ namespace zor::platform {
 
 /// All names but "." and "..", sorted by their bytes; `directory` is a real descriptor, its offset is not used. An
 /// errno when not all could be read.
-[[nodiscard]] std::expected<std::vector<std::string>, int> directoryNames(int directory);
+[[nodiscard]] ErrnoOr<std::vector<std::string>> directoryNames(int directory);
 /// The same for who can do without: none when it cannot be read.
 [[nodiscard]] std::vector<std::string> directoryNamesIfAny(int directory);
 

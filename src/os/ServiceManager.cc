@@ -41,12 +41,12 @@ std::optional<std::chrono::microseconds> NotifySocket::watchdogOfEnvironment() {
     return std::chrono::microseconds(patience);
 }
 
-int NotifySocket::send(std::string_view state) const {
+Errno NotifySocket::send(std::string_view state) const {
     if (address_.empty())
-        return 0;
+        return Errno();
     sockaddr_un target{};
     if ((address_.front() != '/' && address_.front() != '@') || address_.size() >= sizeof target.sun_path)
-        return EINVAL;
+        return Errno(EINVAL);
     target.sun_family = AF_UNIX;
     std::memcpy(target.sun_path, address_.data(), address_.size());
     if (address_.front() == '@')
@@ -54,7 +54,7 @@ int NotifySocket::send(std::string_view state) const {
     const auto targetBytes = static_cast<socklen_t>(offsetof(sockaddr_un, sun_path) + address_.size());
     const FileDescriptor socket(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
     if (!socket.valid())
-        return errno;
+        return Errno::last();
     // A manager that does not read must not hold up a daemon that is ready.
     const timeval patience{.tv_sec = 5, .tv_usec = 0};
     (void)::setsockopt(socket.get(), SOL_SOCKET, SO_SNDTIMEO, &patience, sizeof patience);
@@ -62,9 +62,9 @@ int NotifySocket::send(std::string_view state) const {
         const ssize_t sent = ::sendto(socket.get(), state.data(), state.size(), MSG_NOSIGNAL,
                                       reinterpret_cast<const sockaddr*>(&target), targetBytes);
         if (sent >= 0)
-            return 0;
+            return Errno();
         if (errno != EINTR)
-            return errno;
+            return Errno::last();
     }
 }
 

@@ -4,6 +4,7 @@
 #pragma once
 
 #include "os/FileDescriptor.h"
+#include "platform/Errno.h"
 
 #include <chrono>
 #include <optional>
@@ -25,9 +26,9 @@ public:
     /// How long the manager waits for each "WATCHDOG=1" of this process, as its environment says; absent: it does not.
     [[nodiscard]] static std::optional<std::chrono::microseconds> watchdogOfEnvironment();
 
-    /// "READY=1", "STOPPING=1", "STATUS=..." or several of them, a line each. 0 (also when nobody wants to know) or an
-    /// errno. Waits a few seconds at most.
-    [[nodiscard]] int send(std::string_view state) const;
+    /// "READY=1", "STOPPING=1", "STATUS=..." or several of them, a line each. No error when nobody wants to know. Waits
+    /// a few seconds at most.
+    Errno send(std::string_view state) const;
 
 private:
     std::string address_;

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "os/SystemRoot.h"
 
+#include "base/Try.h"
 #include "os/Names.h"
 #include "os/Openat2.h"
 
@@ -22,30 +23,30 @@ namespace {
 constexpr mode_t runtimeMode = 0755;
 
 /// Makes the directory unless it is there, and opens it.
-std::expected<FileDescriptor, int> makeAndOpen(Disk& disk, int parent, const char* name) {
+ErrnoOr<FileDescriptor> makeAndOpen(Disk& disk, int parent, const char* name) {
     const int made = disk.makeDirectory(parent, name, runtimeMode);
     if (made < 0 && made != -EEXIST)
-        return std::unexpected(-made);
+        return Errno(-made);
     auto opened = openBeneath(parent, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (opened && made == 0) {
         // The process's umask does not decide who can reach the sockets.
         if (const int changed = disk.changeMode(opened->get(), runtimeMode); changed < 0)
-            return std::unexpected(-changed);
+            return Errno(-changed);
     }
     return opened;
 }
 
 } // namespace
 
-std::expected<SystemRoot, int> SystemRoot::open(const std::string& directory) {
+ErrnoOr<SystemRoot> SystemRoot::open(const std::string& directory) {
     const std::unique_ptr<char, decltype(&std::free)> canonical(::realpath(directory.c_str(), nullptr), &std::free);
     if (!canonical)
-        return std::unexpected(errno);
+        return Errno::last();
     SystemRoot root;
     root.canonicalPath_ = canonical.get();
     root.directory_.reset(::open(canonical.get(), O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
     if (!root.directory_.valid())
-        return std::unexpected(errno);
+        return Errno::last();
     return root;
 }
 
@@ -59,27 +60,23 @@ std::string SystemRoot::path(std::string_view systemPath) const {
     return result;
 }
 
-int SystemRoot::makeRuntimeDirectory(Disk& disk) {
-    auto parent = makeAndOpen(disk, directory_.get(), names::runParent);
-    if (!parent)
-        return parent.error();
-    auto directory = makeAndOpen(disk, parent->get(), names::runtimeName);
-    return directory ? adoptRuntimeDirectory(std::move(*directory)) : directory.error();
+Errno SystemRoot::makeRuntimeDirectory(Disk& disk) {
+    const FileDescriptor parent = TRY(makeAndOpen(disk, directory_.get(), names::runParent));
+    return adoptRuntimeDirectory(TRY(makeAndOpen(disk, parent.get(), names::runtimeName)));
 }
 
-int SystemRoot::openRuntimeDirectory() {
-    auto directory = openBeneath(directory_.get(), names::runtimeDirectory, O_RDONLY | O_DIRECTORY);
-    return directory ? adoptRuntimeDirectory(std::move(*directory)) : directory.error();
+Errno SystemRoot::openRuntimeDirectory() {
+    return adoptRuntimeDirectory(TRY(openBeneath(directory_.get(), names::runtimeDirectory, O_RDONLY | O_DIRECTORY)));
 }
 
-int SystemRoot::adoptRuntimeDirectory(FileDescriptor directory) {
+Errno SystemRoot::adoptRuntimeDirectory(FileDescriptor directory) {
     struct stat status{};
     if (::fstat(directory.get(), &status) != 0)
-        return errno;
+        return Errno::last();
     if ((status.st_uid != 0 && status.st_uid != ::geteuid()) || (status.st_mode & (S_IWGRP | S_IWOTH)) != 0)
-        return EPERM;
+        return Errno(EPERM);
     runtimeDirectory_ = std::move(directory);
-    return 0;
+    return Errno();
 }
 
 namespace {
@@ -102,24 +99,23 @@ bool isOwnersLock(const std::string& line, const struct stat& file) {
 
 } // namespace
 
-std::expected<DaemonLock, int> DaemonLock::take(const SystemRoot& root) {
-    auto file = openBeneath(root.runtimeDirectory(), names::lockFile, O_RDWR | O_CREAT | O_NONBLOCK, lockMode);
-    if (!file)
-        return std::unexpected(file.error());
+ErrnoOr<DaemonLock> DaemonLock::take(const SystemRoot& root) {
+    FileDescriptor file =
+        TRY(openBeneath(root.runtimeDirectory(), names::lockFile, O_RDWR | O_CREAT | O_NONBLOCK, lockMode));
     struct stat status{};
-    if (::fstat(file->get(), &status) != 0)
-        return std::unexpected(errno);
+    if (::fstat(file.get(), &status) != 0)
+        return Errno::last();
     if (!S_ISREG(status.st_mode))
-        return std::unexpected(EINVAL);
-    while (::flock(file->get(), LOCK_EX | LOCK_NB) != 0) {
+        return Errno(EINVAL);
+    while (::flock(file.get(), LOCK_EX | LOCK_NB) != 0) {
         if (errno != EINTR)
-            return std::unexpected(errno);
+            return Errno::last();
     }
     // For people who ask who holds it; nothing reads it.
     const std::string pid = std::to_string(::getpid()) + "\n";
-    if (::ftruncate(file->get(), 0) == 0)
-        (void)!::pwrite(file->get(), pid.data(), pid.size(), 0);
-    return DaemonLock(std::move(*file));
+    if (::ftruncate(file.get(), 0) == 0)
+        (void)!::pwrite(file.get(), pid.data(), pid.size(), 0);
+    return DaemonLock(std::move(file));
 }
 
 bool DaemonLock::isHeld(const SystemRoot& root) {
@@ -127,7 +123,7 @@ bool DaemonLock::isHeld(const SystemRoot& root) {
     if (::fstatat(root.runtimeDirectory(), names::lockFile, &status, AT_SYMLINK_NOFOLLOW) != 0)
         return false;
     const FileDescriptor file(::open("/proc/locks", O_RDONLY | O_CLOEXEC));
-    const auto locks = file.valid() ? readSmallFile(file.get(), lockListBytesMax) : std::unexpected(errno);
+    const auto locks = file.valid() ? readSmallFile(file.get(), lockListBytesMax) : Errno::last();
     if (!locks)
         return false;
     for (std::size_t begin = 0; begin < locks->size();) {

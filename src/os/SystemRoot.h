@@ -7,8 +7,8 @@
 
 #include "os/FileDescriptor.h"
 #include "platform/Disk.h"
+#include "platform/Errno.h"
 
-#include <expected>
 #include <string>
 #include <string_view>
 
@@ -16,8 +16,8 @@ namespace zor::platform {
 
 class SystemRoot {
 public:
-    /// An errno when `directory` is no directory.
-    [[nodiscard]] static std::expected<SystemRoot, int> open(const std::string& directory);
+    /// An error when `directory` is no directory.
+    [[nodiscard]] static ErrnoOr<SystemRoot> open(const std::string& directory);
 
     [[nodiscard]] bool isDeviceRoot() const { return canonicalPath_ == "/"; }
     [[nodiscard]] const std::string& canonicalPath() const { return canonicalPath_; }
@@ -27,17 +27,17 @@ public:
     /// so the names of Names.h can be given as they stand; "/" is the root itself.
     [[nodiscard]] std::string path(std::string_view systemPath) const;
 
-    /// Makes run/zorvane (0755) where it is missing and opens it. 0 or an errno: EPERM when the directory belongs to
+    /// Makes run/zorvane (0755) where it is missing and opens it. EPERM when the directory belongs to
     /// somebody else or others can write to it. Called once, before any thread.
-    int makeRuntimeDirectory(Disk& disk);
+    Errno makeRuntimeDirectory(Disk& disk);
     /// Opens run/zorvane as it is, with the same judgement: for programs that look at what a daemon left there.
-    int openRuntimeDirectory();
+    Errno openRuntimeDirectory();
     /// run/zorvane, a real descriptor; -1 until it was made or opened.
     [[nodiscard]] int runtimeDirectory() const { return runtimeDirectory_.get(); }
 
 private:
     SystemRoot() = default;
-    int adoptRuntimeDirectory(FileDescriptor directory);
+    Errno adoptRuntimeDirectory(FileDescriptor directory);
 
     std::string canonicalPath_;
     FileDescriptor directory_;
@@ -48,8 +48,8 @@ private:
 /// gives it up when the process ends, however it ends.
 class DaemonLock {
 public:
-    /// EWOULDBLOCK when another daemon holds it, else an errno.
-    [[nodiscard]] static std::expected<DaemonLock, int> take(const SystemRoot& root);
+    /// EWOULDBLOCK when another daemon holds it.
+    [[nodiscard]] static ErrnoOr<DaemonLock> take(const SystemRoot& root);
 
     /// Whether a daemon holds it, as far as this process can see. Does not try the lock: whoever tries it could keep a
     /// daemon from starting.

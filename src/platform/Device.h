@@ -2,11 +2,11 @@
 // The device as the daemon knows it: one role for each thing that it asks of the device, or tells it.
 #pragma once
 
+#include "platform/Errno.h"
 #include "platform/WorkQueue.h"
 
 #include <cerrno>
 #include <cstdint>
-#include <expected>
 #include <functional>
 #include <memory>
 #include <optional>
@@ -43,10 +43,10 @@ struct PasswordEntry {
 class PasswordDatabase {
 public:
     virtual ~PasswordDatabase() = default;
-    /// ENOENT where the database has no such entry, or one without an absolute home; any other errno where it could not
+    /// ENOENT where the database has no such entry, or one without an absolute home; any other error where it could not
     /// be asked.
-    [[nodiscard]] virtual std::expected<PasswordEntry, int> entryForUserId(std::uint32_t uid) const = 0;
-    [[nodiscard]] virtual std::expected<PasswordEntry, int> entryForName(std::string_view name) const = 0;
+    [[nodiscard]] virtual ErrnoOr<PasswordEntry> entryForUserId(std::uint32_t uid) const = 0;
+    [[nodiscard]] virtual ErrnoOr<PasswordEntry> entryForName(std::string_view name) const = 0;
 };
 
 // The mark that the once-per-boot work is done; it ends with the boot.
@@ -60,8 +60,8 @@ public:
         bool foreign = false;
     };
     [[nodiscard]] virtual State look() const = 0;
-    /// Makes the mark. 0 or an errno.
-    virtual int make() = 0;
+    /// Makes the mark.
+    virtual Errno make() = 0;
     /// Removes the mark: the next launch takes itself for the first of its boot.
     virtual void forget() = 0;
     [[nodiscard]] virtual std::string name() const = 0;
@@ -85,9 +85,9 @@ public:
     static constexpr int locked = 1;
     /// One of these, or another number for another condition. Any thread.
     [[nodiscard]] virtual int currentState() const = 0;
-    /// Calls `changed` on the loop whenever the state may have changed. 0, else a status to log: changes are then found
-    /// a moment late, until it can be done as it should.
-    virtual int registerForChanges(RunLoop& loop, std::function<void()> changed) = 0;
+    /// Calls `changed` on the loop whenever the state may have changed. After an error, which is to be logged, changes
+    /// are found a moment late, until it can be done as it should.
+    virtual Errno registerForChanges(RunLoop& loop, std::function<void()> changed) = 0;
     /// The names in the two log lines of a failed registration.
     [[nodiscard]] virtual const char* registrationCallName() const = 0;
     [[nodiscard]] virtual const char* notificationName() const = 0;
@@ -98,19 +98,19 @@ public:
 /// The class that a file without a recorded one has.
 inline constexpr int defaultProtectionClass = 3;
 
-/// An errno of the kernel's for who takes EPERM for a locked device: an immutable file, a listener that forbids an
+/// An error of the kernel's for who takes EPERM for a locked device: an immutable file, a listener that forbids an
 /// open, are none.
-[[nodiscard]] constexpr int neverLocked(int error) {
-    return error == EPERM ? EACCES : error;
+[[nodiscard]] constexpr Errno neverLocked(Errno error) {
+    return error == EPERM ? Errno(EACCES) : error;
 }
 
 class FileProtectionClass {
 public:
     virtual ~FileProtectionClass() = default;
-    /// The class, or an errno. `fd` is a real descriptor (not O_PATH) of a regular file or a directory.
-    [[nodiscard]] virtual std::expected<int, int> classOf(int fd) const = 0;
-    /// 0 or an errno. EPERM means that the device is locked, and nothing else: the kernel's own EPERM becomes EACCES.
-    virtual int setClass(int fd, int protectionClass) = 0;
+    /// `fd` is a real descriptor (not O_PATH) of a regular file or a directory.
+    [[nodiscard]] virtual ErrnoOr<int> classOf(int fd) const = 0;
+    /// EPERM means that the device is locked, and nothing else: the kernel's own EPERM becomes EACCES.
+    virtual Errno setClass(int fd, int protectionClass) = 0;
     /// False once a set has met a file system without extended attributes.
     [[nodiscard]] virtual bool supported() const = 0;
 };
@@ -124,9 +124,9 @@ class SandboxUserState {
 public:
     virtual ~SandboxUserState() = default;
     /// Sets the mapping to `path`, or removes it when there is none (removing what is not there succeeds).
-    /// 0, else an errno. Any thread; calls for one identifier are serialised by the caller's identifier locks.
-    virtual int setMapping(std::uint32_t userId, SandboxItemType type, std::string_view identifier,
-                           const std::optional<std::string>& path) = 0;
+    /// Any thread; calls for one identifier are serialised by the caller's identifier locks.
+    virtual Errno setMapping(std::uint32_t userId, SandboxItemType type, std::string_view identifier,
+                             const std::optional<std::string>& path) = 0;
     /// Removes every mapping whose target is gone, of the users of whom that may be concluded: a home that is not there
     /// now comes back with its containers. `isGone` is asked of targets inside the system root: it knows where a look
     /// could wait for a user's file system. A launch calls it once. How many were removed.

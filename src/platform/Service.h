@@ -2,6 +2,7 @@
 // The two ways in: requests of clients, and upcalls of the kernel.
 #pragma once
 
+#include "platform/Errno.h"
 #include "platform/PeerIdentity.h"
 #include "platform/WorkQueue.h"
 #include "plist/Value.h"
@@ -72,8 +73,8 @@ struct UpcallPacket {
 class UpcallPort {
 public:
     virtual ~UpcallPort() = default;
-    /// Binds the port under its service name. 0 or an errno; `checkInCallName` names the call that failed.
-    virtual int checkIn() = 0;
+    /// Binds the port under its service name. After an error `checkInCallName` names the call that failed.
+    virtual Errno checkIn() = 0;
     [[nodiscard]] virtual const char* checkInCallName() const = 0;
     /// Serves packets on the loop: the handler returns the reply packet, empty for none. False when no source can be
     /// made; `sourceCallName` then names the call.

@@ -30,49 +30,49 @@ bool fillAddress(const ListenerAddress& address, sockaddr_un& out) {
 
 } // namespace
 
-std::expected<FileDescriptor, int> makeListenerSocket(const ListenerAddress& address, int type, mode_t mode) {
+ErrnoOr<FileDescriptor> makeListenerSocket(const ListenerAddress& address, int type, mode_t mode) {
     sockaddr_un socketAddress = {};
     if (!fillAddress(address, socketAddress))
-        return std::unexpected(ENAMETOOLONG);
+        return Errno(ENAMETOOLONG);
     FileDescriptor socket(::socket(AF_UNIX, type | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
     if (!socket.valid())
-        return std::unexpected(errno);
+        return Errno::last();
     refuseDescriptors(socket.get());
     if (::unlinkat(address.directory, address.name.c_str(), 0) != 0 && errno != ENOENT)
-        return std::unexpected(errno);
+        return Errno::last();
     if (::bind(socket.get(), reinterpret_cast<const sockaddr*>(&socketAddress), sizeof socketAddress) != 0)
-        return std::unexpected(errno);
+        return Errno::last();
     // Until listen, a connect is refused: nobody gets in under the mode that the umask left.
     if (::fchmodat(address.directory, address.name.c_str(), mode, 0) != 0 || ::listen(socket.get(), backlog) != 0) {
-        const int error = errno;
+        const Errno error = Errno::last();
         ::unlinkat(address.directory, address.name.c_str(), 0);
-        return std::unexpected(error);
+        return error;
     }
     return socket;
 }
 
-int adoptListenerSocket(int socket, int type) {
+Errno adoptListenerSocket(int socket, int type) {
     int value = 0;
     socklen_t length = sizeof value;
     if (::getsockopt(socket, SOL_SOCKET, SO_ACCEPTCONN, &value, &length) != 0)
-        return errno;
+        return Errno::last();
     if (value == 0)
-        return EINVAL;
+        return Errno(EINVAL);
     if (::getsockopt(socket, SOL_SOCKET, SO_DOMAIN, &value, &length) != 0 || value != AF_UNIX)
-        return EINVAL;
+        return Errno(EINVAL);
     if (::getsockopt(socket, SOL_SOCKET, SO_TYPE, &value, &length) != 0 || value != type)
-        return EINVAL;
+        return Errno(EINVAL);
     const int flags = ::fcntl(socket, F_GETFL);
     if (flags < 0 || ::fcntl(socket, F_SETFL, flags | O_NONBLOCK) != 0 || ::fcntl(socket, F_SETFD, FD_CLOEXEC) != 0)
-        return errno;
+        return Errno::last();
     refuseDescriptors(socket);
     // Clients are told by the kernel who listens: this process, not the one that made the socket.
-    return ::listen(socket, backlog) == 0 ? 0 : errno;
+    return ::listen(socket, backlog) == 0 ? Errno() : Errno::last();
 }
 
-int enableSenderCredentials(int socket) {
+Errno enableSenderCredentials(int socket) {
     const int on = 1;
-    return ::setsockopt(socket, SOL_SOCKET, SO_PASSCRED, &on, sizeof on) == 0 ? 0 : errno;
+    return ::setsockopt(socket, SOL_SOCKET, SO_PASSCRED, &on, sizeof on) == 0 ? Errno() : Errno::last();
 }
 
 ListenerAcceptor::ListenerAcceptor() : reserve_(::eventfd(0, EFD_CLOEXEC)) {}

@@ -3,9 +3,9 @@
 #pragma once
 
 #include "os/FileDescriptor.h"
+#include "platform/Errno.h"
 #include "service/PassedAlong.h"
 
-#include <expected>
 #include <string>
 #include <sys/types.h>
 
@@ -21,16 +21,15 @@ struct ListenerAddress {
 };
 
 /// Binds and listens, in the place of a socket that an earlier daemon left. `type` is SOCK_STREAM or SOCK_SEQPACKET.
-/// The mode is right before the first client can connect. An errno on failure; no name is left behind then.
-[[nodiscard]] std::expected<FileDescriptor, int> makeListenerSocket(const ListenerAddress& address, int type,
-                                                                    mode_t mode);
+/// The mode is right before the first client can connect. No name is left behind after an error.
+[[nodiscard]] ErrnoOr<FileDescriptor> makeListenerSocket(const ListenerAddress& address, int type, mode_t mode);
 
 /// Makes a listening socket that was passed in ready for use: non-blocking, closed on exec. EINVAL when it is none.
-[[nodiscard]] int adoptListenerSocket(int socket, int type);
+Errno adoptListenerSocket(int socket, int type);
 
 /// Has the kernel say who sent each piece of what arrives. A peer that connects to a listening socket from then on
 /// takes it over.
-[[nodiscard]] int enableSenderCredentials(int socket);
+Errno enableSenderCredentials(int socket);
 
 /// Accepts connections of one listening socket. When the process is out of descriptors, one kept in reserve is spent to
 /// take the connection and close it: else the socket would stay readable and its thread would spin. One thread at a

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "service/SeqpacketUpcallPort.h"
 
-#include "base/ErrorCode.h"
+#include "base/Try.h"
 #include "os/Names.h"
 #include "os/RunLoop.h"
 
@@ -49,28 +49,23 @@ SeqpacketUpcallPort::~SeqpacketUpcallPort() {
     loop_->unwatch(listening_.get());
 }
 
-int SeqpacketUpcallPort::checkIn() {
+Errno SeqpacketUpcallPort::checkIn() {
     if (passed_.valid()) {
         checkInCallName_ = "LISTEN_FDS";
-        if (const int error = adoptListenerSocket(passed_.get(), SOCK_SEQPACKET); error != 0)
-            return error;
+        TRY(adoptListenerSocket(passed_.get(), SOCK_SEQPACKET));
         listening_ = PeerSocket(std::move(passed_));
     } else {
         checkInCallName_ = "bind";
         const ListenerAddress address{.directory = root_.runtimeDirectory(),
                                       .directoryPath = root_.path(names::runtimeDirectory),
                                       .name = names::upcallSocket};
-        auto made = makeListenerSocket(address, SOCK_SEQPACKET, socketMode);
-        if (!made)
-            return made.error();
-        listening_ = PeerSocket(std::move(*made));
+        listening_ = PeerSocket(TRY(makeListenerSocket(address, SOCK_SEQPACKET, socketMode)));
     }
     checkInCallName_ = "setsockopt";
-    if (const int error = enableSenderCredentials(listening_.get()); error != 0)
-        return error;
+    TRY(enableSenderCredentials(listening_.get()));
     // Every accepted socket will be granted the same.
     replyBytesMax_ = raiseSendBuffer(listening_.get());
-    return 0;
+    return Errno();
 }
 
 bool SeqpacketUpcallPort::serve(RunLoop& loop, std::function<std::vector<std::uint8_t>(const UpcallPacket&)> handler) {
@@ -99,7 +94,7 @@ void SeqpacketUpcallPort::acceptConnections() {
         (void)enableSenderCredentials(fd);
         auto peer = identity_.peerOfSocket(fd);
         // The kernel's agent would be nobody as long as it is connected. Closed, it connects again.
-        if (!peer && isOwnShortage(errno))
+        if (!peer && isOwnShortage(Errno::last()))
             continue;
         connections_[fd] = {.socket = std::move(accepted.socket), .peer = std::move(peer)};
         if (!loop_->watch(fd, [this, fd] { serveConnection(fd); }))

@@ -11,6 +11,7 @@
 
 #include "os/FileDescriptor.h"
 #include "os/SystemRoot.h"
+#include "platform/Errno.h"
 #include "platform/Service.h"
 #include "service/ListenerSocket.h"
 
@@ -31,7 +32,7 @@ public:
     SeqpacketUpcallPort(const SeqpacketUpcallPort&) = delete;
     SeqpacketUpcallPort& operator=(const SeqpacketUpcallPort&) = delete;
 
-    int checkIn() override;
+    Errno checkIn() override;
     [[nodiscard]] const char* checkInCallName() const override { return checkInCallName_; }
     /// The loop has to outlive the port.
     bool serve(RunLoop& loop, std::function<std::vector<std::uint8_t>(const UpcallPacket&)> handler) override;

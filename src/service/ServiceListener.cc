@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "service/ServiceListener.h"
 
-#include "base/ErrorCode.h"
+#include "base/Try.h"
 #include "service/ListenerCore.h"
 
 #include <cerrno>
@@ -57,8 +57,8 @@ private:
     void admit(PeerSocket socket) {
         // A peer that connected before the listening socket came to the daemon has not taken it over. Whatever such a
         // one has sent would come with descriptors in the place of credentials.
-        if (const int error = enableSenderCredentials(socket.get()); error != 0)
-            return core_.incidents.happened(ListenerIncident::unknownPeer, error);
+        if (const Errno error = enableSenderCredentials(socket.get()))
+            return core_.incidents.happened(ListenerIncident::unknownPeer, error.number());
         ucred credentials = {};
         socklen_t length = sizeof credentials;
         if (::getsockopt(socket.get(), SOL_SOCKET, SO_PEERCRED, &credentials, &length) != 0)
@@ -67,7 +67,7 @@ private:
         ListenerCharges::Account* account = nullptr;
         std::unique_ptr<Peer> peer;
         std::shared_ptr<ListenerConnection> connection;
-        int error = 0;
+        Errno error;
         try {
             account = core_.charges.openConnection(credentials.uid, identity_.ownsRoot(credentials.uid));
             if (!account)
@@ -76,16 +76,16 @@ private:
             if (peer)
                 connection = core_.unusedConnection();
             else
-                error = errno;
+                error = Errno::last();
         } catch (const std::bad_alloc&) {
-            error = ENOMEM; // refused like one for which there is no descriptor
+            error = Errno(ENOMEM); // refused like one for which there is no descriptor
         }
         if (connection) {
             ++core_.accepted;
             return connection->open(std::move(socket), std::move(peer), *account);
         }
         core_.incidents.happened(
-            isOwnShortage(error) ? ListenerIncident::outOfDescriptors : ListenerIncident::unknownPeer, error);
+            isOwnShortage(error) ? ListenerIncident::outOfDescriptors : ListenerIncident::unknownPeer, error.number());
         if (account)
             core_.charges.closeConnection(*account);
     }
@@ -133,44 +133,40 @@ ServiceListener::~ServiceListener() {
 }
 
 bool ServiceListener::resume(ServiceHandler handler) {
-    const int error = begin(std::move(handler));
-    if (error == 0)
+    const Errno error = begin(std::move(handler));
+    if (!error)
         return true;
     // Clients would get in and wait for ever.
     stop();
-    errno = error;
+    errno = error.number();
     return false;
 }
 
-int ServiceListener::begin(ServiceHandler handler) {
-    if (const int error = takeSocket(); error != 0)
-        return error;
-    if (const int error = enableSenderCredentials(socket_.get()); error != 0)
-        return error;
+Errno ServiceListener::begin(ServiceHandler handler) {
+    TRY(takeSocket());
+    TRY(enableSenderCredentials(socket_.get()));
     core_ = std::make_unique<ListenerCore>(options_.limits, options_.report);
     core_->handler = std::move(handler);
     acceptance_ = std::make_unique<Acceptance>(socket_.get(), identity_, *core_);
     if (!core_->pool.start())
-        return EAGAIN;
+        return Errno(EAGAIN);
     probe_ = std::make_unique<Probe>(core_->pool);
-    return core_->pool.add(socket_.get(), *acceptance_, EPOLLIN | EPOLLONESHOT) && probe_->start() ? 0 : errno;
+    return core_->pool.add(socket_.get(), *acceptance_, EPOLLIN | EPOLLONESHOT) && probe_->start() ? Errno()
+                                                                                                   : Errno::last();
 }
 
 bool ServiceListener::answers() {
     return probe_ && probe_->answers();
 }
 
-int ServiceListener::takeSocket() {
+Errno ServiceListener::takeSocket() {
     if (options_.passed.valid()) {
         socket_ = PeerSocket(std::move(options_.passed));
         return adoptListenerSocket(socket_.get(), SOCK_STREAM);
     }
-    auto made = makeListenerSocket(options_.address, SOCK_STREAM, 0666);
-    if (!made)
-        return made.error();
-    socket_ = PeerSocket(std::move(*made));
+    socket_ = PeerSocket(TRY(makeListenerSocket(options_.address, SOCK_STREAM, 0666)));
     socketIsOurs_ = true;
-    return 0;
+    return Errno();
 }
 
 void ServiceListener::stop() {

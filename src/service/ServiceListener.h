@@ -11,6 +11,7 @@
 // PassedAlong           descriptors sent by peers
 #pragma once
 
+#include "platform/Errno.h"
 #include "platform/PeerIdentity.h"
 #include "platform/Service.h"
 #include "service/ListenerIncidents.h"
@@ -74,9 +75,9 @@ private:
     class Acceptance;
     class Probe;
 
-    /// 0 or an errno, and then something may have begun.
-    [[nodiscard]] int begin(ServiceHandler handler);
-    [[nodiscard]] int takeSocket();
+    /// Something may have begun in spite of an error.
+    Errno begin(ServiceHandler handler);
+    Errno takeSocket();
 
     PeerIdentity& identity_;
     ListenerOptions options_;

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "service/StatusSocket.h"
 
+#include "base/Try.h"
 #include "ipc/Frame.h"
 #include "plist/Binary.h"
 
@@ -32,28 +33,24 @@ StatusSocket::~StatusSocket() {
     close();
 }
 
-int StatusSocket::open(const ListenerAddress& address) {
-    auto made = makeListenerSocket(address, SOCK_STREAM, 0666);
-    if (!made)
-        return made.error();
-    listening_ = PeerSocket(std::move(*made));
+Errno StatusSocket::open(const ListenerAddress& address) {
+    listening_ = PeerSocket(TRY(makeListenerSocket(address, SOCK_STREAM, 0666)));
     made_ = address;
     return serve();
 }
 
-int StatusSocket::adopt(FileDescriptor listening) {
-    if (const int error = adoptListenerSocket(listening.get(), SOCK_STREAM); error != 0)
-        return error;
+Errno StatusSocket::adopt(FileDescriptor listening) {
+    TRY(adoptListenerSocket(listening.get(), SOCK_STREAM));
     listening_ = PeerSocket(std::move(listening));
     return serve();
 }
 
-int StatusSocket::serve() {
+Errno StatusSocket::serve() {
     if (runLoop_.watch(listening_.get(), [this] { answerAll(); }))
-        return 0;
-    const int error = errno;
+        return Errno();
+    const Errno error = Errno::last();
     close();
-    return error != 0 ? error : ENOMEM;
+    return error ? error : Errno(ENOMEM);
 }
 
 void StatusSocket::close() {

@@ -7,6 +7,7 @@
 #pragma once
 
 #include "os/RunLoop.h"
+#include "platform/Errno.h"
 #include "platform/PeerIdentity.h"
 #include "plist/Value.h"
 #include "service/ListenerSocket.h"
@@ -27,15 +28,15 @@ public:
     StatusSocket(const StatusSocket&) = delete;
     StatusSocket& operator=(const StatusSocket&) = delete;
 
-    /// Makes the socket (mode 0666) and begins to answer. 0 or an errno. The address's directory stays open meanwhile.
-    [[nodiscard]] int open(const ListenerAddress& address);
+    /// Makes the socket (mode 0666) and begins to answer. The address's directory stays open meanwhile.
+    Errno open(const ListenerAddress& address);
     /// The same with a listening socket that the service manager made.
-    [[nodiscard]] int adopt(FileDescriptor listening);
+    Errno adopt(FileDescriptor listening);
     /// Ends it; a socket that open made is removed. On the loop's thread, or when the loop does not run.
     void close();
 
 private:
-    [[nodiscard]] int serve();
+    Errno serve();
     void answerAll();
     void answer(int socket);
     /// False when it cannot be written as a frame.

@@ -85,7 +85,7 @@ Result<void> ClassDirectoryReader::forEach(const std::function<void(std::shared_
                             ? disk.hidesNames(directory->get())
                             : directory.error() == ENOENT && fs::hiddenBy(fileManager_.resolver(), disk, directory_);
     if (!directory || hidden) {
-        const int number = hidden ? ENOKEY : directory.error();
+        const int number = hidden ? ENOKEY : directory.error().number();
         if (number != ENOENT)
             log_.write(logLevelError, "_IterateDirectory", "opendir of %s failed: %s", directory_.c_str(),
                        errorText(number));

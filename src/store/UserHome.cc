@@ -20,31 +20,26 @@ namespace {
 /// How long a home that was there is taken to be there still by who only reads what is cached.
 constexpr std::int64_t lookEveryMilliseconds = 1000;
 
-std::expected<FileURL, int> resolved(const platform::PasswordEntry& entry, HomeQuestion& question) {
+ErrnoOr<FileURL> resolved(const platform::PasswordEntry& entry, HomeQuestion& question) {
     // A home may be reached through links that its administrator made; below it, none is followed.
     const auto path = question.ask(
-        [home = entry.homeDirectory]() -> std::expected<std::string, int> {
+        [home = entry.homeDirectory]() -> ErrnoOr<std::string> {
             char whole[PATH_MAX];
             if (!::realpath(home.c_str(), whole))
-                return std::unexpected(errno);
+                return Errno::last();
             return whole;
         },
         fs::homePatience);
     if (!path)
-        return std::unexpected(EHOSTDOWN);
-    if (!*path)
-        return std::unexpected(path->error());
-    return FileURL::directory(**path);
+        return Errno(EHOSTDOWN);
+    return FileURL::directory(TRY(*path));
 }
 
 } // namespace
 
-std::expected<FileURL, int> UserHome::pathOf(const platform::PasswordDatabase& passwords, std::uint32_t userId,
-                                             HomeQuestion& question) {
-    const auto entry = passwords.entryForUserId(userId);
-    if (!entry)
-        return std::unexpected(entry.error());
-    return resolved(*entry, question);
+ErrnoOr<FileURL> UserHome::pathOf(const platform::PasswordDatabase& passwords, std::uint32_t userId,
+                                  HomeQuestion& question) {
+    return resolved(TRY(passwords.entryForUserId(userId)), question);
 }
 
 UserHome::Found UserHome::find() {
@@ -54,8 +49,8 @@ UserHome::Found UserHome::find() {
     const auto path = resolved(*entry, wayToHome_);
     if (path)
         resolver_.fence(*path, fs::MountFence::Kind::home);
-    const auto opened = path ? resolver_.openDirectoryPath(*path) : std::unexpected(path.error());
-    const auto id = opened ? fs::directoryIdOf(opened->get()) : std::unexpected(opened.error());
+    const auto opened = path ? resolver_.openDirectoryPath(*path) : path.error();
+    const auto id = opened ? fs::directoryIdOf(opened->get()) : opened.error();
     if (!id)
         return {.state = isOwnShortage(id.error()) ? State::unknown : State::missing, .directory = {}, .id = {}};
     return {.state = State::present, .directory = std::make_shared<const FileURL>(*path), .id = *id};
@@ -77,8 +72,8 @@ UserHome::Seen UserHome::look() {
         before = found_;
     }
     // The database is asked when there is nothing yet, or when what it named has changed.
-    const auto opened = before.directory ? resolver_.openDirectoryPath(*before.directory) : std::unexpected(ENOENT);
-    const auto id = opened ? fs::directoryIdOf(opened->get()) : std::unexpected(opened.error());
+    const auto opened = before.directory ? resolver_.openDirectoryPath(*before.directory) : Errno(ENOENT);
+    const auto id = opened ? fs::directoryIdOf(opened->get()) : opened.error();
     Found now = id && *id == before.id ? before : find();
     const MutexLock held(mutex_);
     dueMilliseconds_ = now.state == State::present ? coarseMilliseconds() + lookEveryMilliseconds : 0;

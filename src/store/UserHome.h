@@ -15,17 +15,17 @@
 #include "fs/PathResolver.h"
 #include "os/BoundedQuestion.h"
 #include "platform/Device.h"
+#include "platform/Errno.h"
 
 #include <atomic>
 #include <cstdint>
-#include <expected>
 #include <memory>
 #include <string>
 
 namespace zor {
 
-/// Leads to a home's path without links, or to an errno.
-using HomeQuestion = platform::BoundedQuestion<std::expected<std::string, int>>;
+/// Leads to a home's path without links, or to an error.
+using HomeQuestion = platform::BoundedQuestion<ErrnoOr<std::string>>;
 
 class UserHome {
 public:
@@ -56,10 +56,10 @@ public:
     /// The last look's; 0 before the first. One atomic read.
     [[nodiscard]] std::uint64_t generation() const { return generation_.load(std::memory_order_acquire); }
 
-    /// The home that the password database names, without links; the errno when it names none, or one that is not
+    /// The home that the password database names, without links; an error when it names none, or one that is not
     /// there; EHOSTDOWN when what the way to it lies on does not answer. `question` is one for each user.
-    [[nodiscard]] static std::expected<FileURL, int> pathOf(const platform::PasswordDatabase& passwords,
-                                                            std::uint32_t userId, HomeQuestion& question);
+    [[nodiscard]] static ErrnoOr<FileURL> pathOf(const platform::PasswordDatabase& passwords, std::uint32_t userId,
+                                                 HomeQuestion& question);
 
 private:
     struct Found {

@@ -116,8 +116,8 @@ void ZORContainerCache::prepare(std::uint32_t userId, ContainerClass containerCl
 
 int ZORContainerCache::lookForDirectory(const Key& key) {
     const auto place = configuration_.placeOfClass(key.userId, key.containerClass, key.transient);
-    const auto directory = place ? fileManager_.resolver().openDirectory(*place) : std::unexpected(ENOENT);
-    return directory ? 0 : directory.error();
+    const auto directory = place ? fileManager_.resolver().openDirectory(*place) : Errno(ENOENT);
+    return directory ? 0 : directory.error().number();
 }
 
 Result<ZORContainerCache::ClassCache> ZORContainerCache::readClassDirectory(const Key& key) {
@@ -140,7 +140,7 @@ Result<ZORContainerCache::ClassCache> ZORContainerCache::readClassDirectory(cons
     // A daemon that was killed may have left containers here that are not on the disk yet; who finds one here is told
     // that it exists.
     const auto opened = fileManager_.resolver().openDirectory(*directory);
-    const int synced = opened ? durability_.afterMove(opened->get()) : -opened.error();
+    const int synced = opened ? durability_.afterMove(opened->get()) : -opened.error().number();
     if (synced < 0)
         return posixError(ZOR_HERE, -synced, "sync of %s failed: %s", directory->c_str(), errorText(-synced));
     return cache;

@@ -168,13 +168,13 @@ Result<bool> ZORGlobalConfiguration::closeHomeDirectory() {
         return false;
     }
     struct stat status{};
-    int failure = !opened ? opened.error() : ::fstat(opened->get(), &status) != 0 ? errno : 0;
-    const bool isOpen = failure == 0 && (status.st_mode & (S_IRWXG | S_IRWXO)) != 0;
-    if (failure == 0 && isOpen && status.st_uid == ::geteuid())
-        failure = -fileManager_.disk().changeMode(opened->get(), closedMode);
+    Errno failure = !opened ? opened.error() : ::fstat(opened->get(), &status) != 0 ? Errno::last() : Errno();
+    const bool isOpen = !failure && (status.st_mode & (S_IRWXG | S_IRWXO)) != 0;
+    if (!failure && isOpen && status.st_uid == ::geteuid())
+        failure = Errno(-fileManager_.disk().changeMode(opened->get(), closedMode));
     else if (isOpen)
-        failure = EPERM;
-    if (failure != 0)
+        failure = Errno(EPERM);
+    if (failure)
         return posixError(ZOR_HERE, failure, "%s cannot be closed to others, who may read what is deleted: %s",
                           home.c_str(), errorText(failure));
     return isOpen;

@@ -189,8 +189,8 @@ std::expected<std::shared_ptr<ZORMetadata>, MetadataRefusal> MetadataReader::jud
     const auto bytes = fs::readOwnedFile(disk_, directory_, relative.c_str(), fs::metadataFileBytesMax, formerOwner_);
     if (!bytes) {
         const bool hidden = bytes.error() == ENOENT && fs::hidesNamesBelow(disk_, directory_, name);
-        const int number = hidden ? ENOKEY : bytes.error();
-        const ZORError cause = posixError(ZOR_HERE, number, "%s", errorText(number));
+        const Errno error = hidden ? Errno(ENOKEY) : bytes.error();
+        const ZORError cause = posixError(ZOR_HERE, error, "%s", errorText(error));
         return refusal(MetadataRule::readable, ErrorCode::metadataUnreadable, __LINE__,
                        formatted("Failed to read metadata at URL %s", place.url().c_str()),
                        std::make_shared<const ZORError>(cause));

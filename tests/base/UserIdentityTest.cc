@@ -12,16 +12,16 @@ namespace {
 class CountingPasswords final : public platform::PasswordDatabase {
 public:
     explicit CountingPasswords(std::uint32_t mobile) : mobile_(mobile) {}
-    [[nodiscard]] std::expected<platform::PasswordEntry, int> entryForUserId(std::uint32_t) const override {
-        return std::unexpected(ENOENT);
+    [[nodiscard]] ErrnoOr<platform::PasswordEntry> entryForUserId(std::uint32_t) const override {
+        return Errno(ENOENT);
     }
-    [[nodiscard]] std::expected<platform::PasswordEntry, int> entryForName(std::string_view name) const override {
+    [[nodiscard]] ErrnoOr<platform::PasswordEntry> entryForName(std::string_view name) const override {
         ++lookups;
         std::this_thread::sleep_for(std::chrono::milliseconds(5));
         if (failure != 0)
-            return std::unexpected(failure);
+            return Errno(failure);
         if (name != "mobile")
-            return std::unexpected(ENOENT);
+            return Errno(ENOENT);
         return platform::PasswordEntry{.name = "mobile", .uid = mobile_, .homeDirectory = "/private/var/mobile"};
     }
     mutable std::atomic<int> lookups{0};

@@ -36,7 +36,7 @@ struct Store {
         group = create("group.a", ContainerClass::sharedAppGroup, 501);
         create("systemgroup.a", ContainerClass::sharedSystemGroup, 499);
         create("org.system", ContainerClass::dataSystem, 499);
-        world.bootMarker.make();
+        (void)world.bootMarker.make();
     }
     void registerOwner(const char* identifier, plist::Dictionary entitlements) {
         entitlements.set(std::string(entitlementKeys::systemContainer), true);
@@ -44,7 +44,7 @@ struct Store {
     }
     void setProtectionClass(const std::string& subdirectory) {
         const platform::FileDescriptor file(::open((data + subdirectory).c_str(), O_RDONLY | O_CLOEXEC));
-        EXPECT_EQ(world.protection().setClass(file.get(), 1), 0);
+        EXPECT_FALSE(world.protection().setClass(file.get(), 1));
     }
     std::string create(const std::string& identifier, ContainerClass containerClass, std::uint32_t user,
                        bool transient = false) {
@@ -283,7 +283,7 @@ TEST(StoreCheckTest, KnowsWhatIsNoFault) {
     store.registerOwner("com.veltra.settingsd",
                         {{std::string(entitlementKeys::applicationGroups), plist::Array{plist::Value("group.new")}}});
     store.create("com.veltra.settingsd", ContainerClass::dataSystem, 499);
-    ASSERT_EQ(store.world.sandbox.setMapping(501, platform::SandboxItemType::dataContainer, "org.data", store.data), 0);
+    ASSERT_FALSE(store.world.sandbox.setMapping(501, platform::SandboxItemType::dataContainer, "org.data", store.data));
     store.setProtectionClass("/tmp");
     CheckOptions options{.changingProtection = {store.dataUuid}, .pause = std::chrono::milliseconds(0)};
     const auto findings = store.check(options);

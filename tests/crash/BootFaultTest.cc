@@ -32,7 +32,7 @@ void put(const test::World& world, const std::string& path, const plist::Diction
 
 struct OldDevice {
     explicit OldDevice(platform::Disk& ofTheBoot) : disk(ofTheBoot), device("/dev/shm") {
-        device.marker.make();
+        (void)device.marker.make();
         device.start(disk, journalEverywhere);
         test::World& world = device.daemon->world;
         must(world.entitle("com.veltra.settingsd", entitlements({}, {}, true)) == ErrorCode::success,

@@ -24,7 +24,7 @@ struct FaultWorld {
 std::unique_ptr<FaultWorld> makeWorld(const std::string& parent, Home home, const Scenario& scenario, FaultDisk& disk) {
     auto world = std::make_unique<FaultWorld>(disk, parent, home);
     // The setup of the boot has its own scenario; without it, the directories that operations make are missing.
-    world->device.marker.make();
+    (void)world->device.marker.make();
     world->device.start(disk, world->probe());
     scenario.prepare(world->device);
     return world;

@@ -83,7 +83,9 @@ private:
 
 /// A daemon over a store that is at rest, to be asked what only a client can see.
 struct LaterDaemon {
-    explicit LaterDaemon(const std::string& root) : daemon(root, marker, disk, journalEverywhere) { marker.make(); }
+    explicit LaterDaemon(const std::string& root) : daemon(root, marker, disk, journalEverywhere) {
+        (void)marker.make();
+    }
     test::FlagBootMarker marker;
     platform::LinuxDisk disk{platform::Syncs::off};
     StoreDaemon daemon;

@@ -33,10 +33,10 @@ TEST(LinuxPlatform, OwnsOneRootAtATime) {
         const Platform roles = platform.roles();
         EXPECT_EQ(roles.root.canonicalPath(), canonical);
         EXPECT_TRUE(roles.listener.resume([](PeerConnection&, ServiceEvent&) {}));
-        EXPECT_EQ(roles.upcallPort.checkIn(), 0);
+        EXPECT_FALSE(roles.upcallPort.checkIn());
         EXPECT_TRUE(
             roles.upcallPort.serve(roles.runLoop, [](const UpcallPacket&) { return std::vector<std::uint8_t>(); }));
-        EXPECT_EQ(roles.lockState.registerForChanges(roles.runLoop, [] {}), 0);
+        EXPECT_FALSE(roles.lockState.registerForChanges(roles.runLoop, [] {}));
         std::atomic<int> ran{0};
         EXPECT_TRUE(roles.deathRowQueue.start() && roles.lockStateQueue.start());
         roles.deathRowQueue.async([&] { ++ran; });

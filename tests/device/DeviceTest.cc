@@ -71,7 +71,7 @@ TEST(BootMarker, BelievesOnlyItsOwn) {
     const std::function<void(const std::string&)> tricks[] = {link, open, symbolic, given};
     for (const auto& trick : std::span(tricks).first(::geteuid() == 0 ? 4 : 3))
         for (const auto& [mark, otherMark] : {std::pair(semaphore, file), std::pair(file, semaphore)}) {
-            ASSERT_EQ(marker.make(), 0) << "a foreign one is replaced";
+            ASSERT_FALSE(marker.make()) << "a foreign one is replaced";
             ASSERT_EQ(::unlink(otherMark.c_str()), 0);
             EXPECT_TRUE(marker.look().present) << mark;
             EXPECT_FALSE(marker.look().foreign);
@@ -83,10 +83,10 @@ TEST(BootMarker, BelievesOnlyItsOwn) {
     // Who keeps the semaphore's name taken makes no launch a boot.
     marker.forget();
     ASSERT_EQ(::mkdir(semaphore.c_str(), 0755) | ::mkdir((semaphore + "/kept").c_str(), 0755), 0);
-    EXPECT_EQ(marker.make(), 0);
+    EXPECT_FALSE(marker.make());
     EXPECT_TRUE(marker.look().present && marker.look().foreign);
     ::rmdir((semaphore + "/kept").c_str());
-    EXPECT_EQ(marker.make(), 0);
+    EXPECT_FALSE(marker.make());
     EXPECT_FALSE(marker.look().foreign);
     // A file of another boot says nothing of this one.
     marker.forget();
@@ -153,23 +153,23 @@ TEST(SandboxUserState, MapsReplacesAndRemoves) {
     TestRoot test;
     LinkSandboxUserState sandbox(test.root(), test.disk());
     const std::string name = test.path("run/zorvane/sandbox/501/1/a%2Fb");
-    EXPECT_EQ(sandbox.setMapping(501, data, "a/b", std::nullopt), 0);
+    EXPECT_FALSE(sandbox.setMapping(501, data, "a/b", std::nullopt));
     EXPECT_NE(::access(test.path("run/zorvane/sandbox").c_str(), F_OK), 0) << "a removal makes nothing";
-    EXPECT_EQ(sandbox.setMapping(501, data, "a/b", "/first"), 0);
+    EXPECT_FALSE(sandbox.setMapping(501, data, "a/b", "/first"));
     // What a kill between the two steps leaves under a name that is used again.
     ASSERT_EQ(::symlink("x", test.path("run/zorvane/sandbox/501/1/.new-1").c_str()), 0);
-    EXPECT_EQ(sandbox.setMapping(501, data, "a/b", "/second"), 0);
-    EXPECT_EQ(sandbox.setMapping(501, SandboxItemType::groupContainer, "a/b", "/group"), 0);
+    EXPECT_FALSE(sandbox.setMapping(501, data, "a/b", "/second"));
+    EXPECT_FALSE(sandbox.setMapping(501, SandboxItemType::groupContainer, "a/b", "/group"));
     EXPECT_EQ(linkTarget(name), "/second");
     EXPECT_EQ(linkTarget(test.path("run/zorvane/sandbox/501/2/a%2Fb")), "/group");
-    EXPECT_EQ(sandbox.setMapping(501, data, "a/b", std::nullopt), 0);
-    EXPECT_EQ(sandbox.setMapping(501, data, "a/b", std::nullopt), 0);
+    EXPECT_FALSE(sandbox.setMapping(501, data, "a/b", std::nullopt));
+    EXPECT_FALSE(sandbox.setMapping(501, data, "a/b", std::nullopt));
     EXPECT_EQ(linkTarget(name), "");
-    EXPECT_EQ(sandbox.setMapping(501, data, "", "/x"), EINVAL);
+    EXPECT_EQ(sandbox.setMapping(501, data, "", "/x").number(), EINVAL);
     const std::string longest(255, 'i');
-    EXPECT_EQ(sandbox.setMapping(501, data, longest, "/x"), 0);
-    EXPECT_EQ(sandbox.setMapping(501, data, longest + "i", "/x"), ENAMETOOLONG);
-    EXPECT_EQ(sandbox.setMapping(501, data, std::string(86, '/'), std::nullopt), ENAMETOOLONG);
+    EXPECT_FALSE(sandbox.setMapping(501, data, longest, "/x"));
+    EXPECT_EQ(sandbox.setMapping(501, data, longest + "i", "/x").number(), ENAMETOOLONG);
+    EXPECT_EQ(sandbox.setMapping(501, data, std::string(86, '/'), std::nullopt).number(), ENAMETOOLONG);
     EXPECT_EQ(linkTarget(test.path("run/zorvane/sandbox/501/1/.new-1")), "");
 }
 
@@ -185,7 +185,7 @@ TEST(SandboxUserState, RemovesDanglingMappings) {
     EXPECT_EQ(remove(), 0U);
     test.makeDirectories("private/var/mobile/live");
     const auto map = [&](const char* identifier, const std::string& target) {
-        ASSERT_EQ(sandbox.setMapping(501, SandboxItemType::dataContainer, identifier, target), 0);
+        ASSERT_FALSE(sandbox.setMapping(501, SandboxItemType::dataContainer, identifier, target));
     };
     map("live", test.path("private/var/mobile/live"));
     map("gone", test.path("private/var/mobile/gone"));
@@ -225,24 +225,24 @@ TEST(FileProtectionClass, RefusesWhatALockTakesAway) {
         for (const int from : classes) {
             for (const int to : classes) {
                 setState(0);
-                ASSERT_EQ(protection.setClass(file.get(), from), 0);
+                ASSERT_EQ(protection.setClass(file.get(), from).number(), 0);
                 setState(state);
                 const bool refused = state == 1 && (from == 1 || from == 2 || to == 1 || to == 2);
-                EXPECT_EQ(protection.setClass(file.get(), to), refused ? EPERM : 0) << state << from << to;
+                EXPECT_EQ(protection.setClass(file.get(), to).number(), refused ? EPERM : 0) << state << from << to;
                 EXPECT_EQ(protection.classOf(file.get()), refused ? from : to);
             }
         }
     }
     setState(0);
-    EXPECT_EQ(protection.setClass(file.get(), -1), EINVAL);
+    EXPECT_EQ(protection.setClass(file.get(), -1).number(), EINVAL);
     for (const char* text : {"", "x", "1x", "-1", "4294967298", "00000000000000000001"}) {
         ASSERT_EQ(::fsetxattr(file.get(), protection.attributeName(), text, std::strlen(text), 0), 0);
         EXPECT_EQ(protection.classOf(file.get()), 3) << text;
     }
-    EXPECT_EQ(protection.setClass(-1, 1), EBADF);
+    EXPECT_EQ(protection.setClass(-1, 1).number(), EBADF);
     // What an encryption keeps from being read can be opened for its path alone.
     const FileDescriptor path(::open(test.path("file").c_str(), O_PATH | O_CLOEXEC));
-    EXPECT_EQ(protection.setClass(path.get(), 4), 0);
+    EXPECT_EQ(protection.setClass(path.get(), 4).number(), 0);
     EXPECT_EQ(protection.classOf(path.get()), 4);
     EXPECT_EQ(protection.classOf(file.get()), 4);
 }
@@ -254,7 +254,7 @@ TEST(WantOfDescriptors, AnUnlockIsSeenAfterwards) {
     RunLoop loop;
     FileDeviceLockState state(test.root());
     std::atomic<int> seen{-2};
-    ASSERT_EQ(state.registerForChanges(loop, [&] { seen = state.currentState(); }), 0);
+    ASSERT_FALSE(state.registerForChanges(loop, [&] { seen = state.currentState(); }));
     std::thread runner([&] { loop.run(); });
     const auto sees = [&](int expected) { return eventually([&] { return seen == expected; }); };
     test.replace(lockStateFile, "1");

@@ -306,7 +306,7 @@ TEST(WantOfDescriptors, APeerIsRefusedAndNotMistaken) {
 
     RunLoop loop;
     SeqpacketUpcallPort port(world.test.root(), world.identity, {});
-    ASSERT_EQ(port.checkIn(), 0);
+    ASSERT_FALSE(port.checkIn());
     ASSERT_TRUE(port.serve(loop, [](const UpcallPacket&) { return std::vector<std::uint8_t>(); }));
     const FileDescriptor agent(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
     ASSERT_TRUE(support::connectTo(agent.get(),

@@ -11,16 +11,15 @@ namespace {
 std::expected<ConfiguredUsers, std::string> read(std::string_view text) {
     static const std::vector<Account> database = {
         {"root", 0}, {"www-data", 33}, {"zorvane-installer", 990}, {"zorvane-system", 991}, {"ann", 1000}};
-    const auto find = [](auto matches) -> std::expected<Account, int> {
+    const auto find = [](auto matches) -> ErrnoOr<Account> {
         const auto found = std::ranges::find_if(database, matches);
-        return found == database.end() ? std::unexpected(ENOENT) : std::expected<Account, int>(*found);
+        return found == database.end() ? Errno(ENOENT) : ErrnoOr<Account>(*found);
     };
     return readUserNumbers(
         text,
         {.named =
              [&](std::string_view name) {
-                 return name == "broken" ? std::unexpected(EIO)
-                                         : find([&](const Account& a) { return a.name == name; });
+                 return name == "broken" ? Errno(EIO) : find([&](const Account& a) { return a.name == name; });
              },
          .numbered = [&](std::uint32_t number) { return find([&](const Account& a) { return a.number == number; }); }});
 }

@@ -118,7 +118,7 @@ TEST(NotifySocket, SendsOneDatagram) {
                                                 {"relative", EINVAL},
                                                 {"/" + std::string(200, 'x'), EINVAL}};
     for (const auto& [path, result] : rows)
-        EXPECT_EQ(NotifySocket(path).send("READY=1"), result) << path;
+        EXPECT_EQ(NotifySocket(path).send("READY=1").number(), result) << path;
     char buffer[64];
     EXPECT_EQ(::recv(socket.get(), buffer, sizeof buffer, MSG_DONTWAIT), 7);
 }

@@ -25,17 +25,17 @@ TEST(SystemRoot, MapsPathsAndRefusesARuntimeDirectoryOfOthers) {
     EXPECT_TRUE(device.isDeviceRoot());
     EXPECT_EQ(device.path("/private/var"), "/private/var");
     EXPECT_EQ(device.path("/"), "/");
-    EXPECT_EQ(SystemRoot::open(test.path("absent")).error(), ENOENT);
+    EXPECT_EQ(SystemRoot::open(test.path("absent")).error().number(), ENOENT);
     LinuxDisk disk(Syncs::off);
     ASSERT_EQ(::symlink(test.path().c_str(), test.path("link").c_str()), 0);
     SystemRoot again = SystemRoot::open(test.path("link")).value();
     EXPECT_EQ(again.canonicalPath(), root.canonicalPath());
-    EXPECT_EQ(again.makeRuntimeDirectory(disk), 0);
+    EXPECT_FALSE(again.makeRuntimeDirectory(disk));
     ::chmod(test.path("run/zorvane").c_str(), 0775);
-    EXPECT_EQ(again.makeRuntimeDirectory(disk), EPERM);
+    EXPECT_EQ(again.makeRuntimeDirectory(disk).number(), EPERM);
     ASSERT_EQ(::rename(test.path("run/zorvane").c_str(), test.path("run/elsewhere").c_str()), 0);
     ASSERT_EQ(::symlink("elsewhere", test.path("run/zorvane").c_str()), 0);
-    EXPECT_NE(again.makeRuntimeDirectory(disk), 0);
+    EXPECT_TRUE(again.makeRuntimeDirectory(disk));
 }
 
 // One daemon on one root, and the lock goes with the process however it ends. Another user's lock on an inode of that
@@ -47,7 +47,7 @@ TEST(DaemonLock, HoldsOffASecondDaemon) {
             continue;
         const pid_t child = ::fork();
         if (child == 0) {
-            std::optional<std::expected<DaemonLock, int>> lock;
+            std::optional<ErrnoOr<DaemonLock>> lock;
             bool held = false;
             if (isAnothers)
                 held = ::flock(::open(test.path("run/zorvane/zorvaned.lock").c_str(), O_RDWR), LOCK_EX) == 0 &&

@@ -90,7 +90,7 @@ class StatusWorld {
 public:
     explicit StatusWorld(StatusSocket::Build build, FileDescriptor passed = FileDescriptor())
         : status_(identity, loop_, std::move(build)) {
-        EXPECT_EQ(passed.valid() ? status_.adopt(std::move(passed)) : status_.open(directory.address()), 0);
+        EXPECT_FALSE(passed.valid() ? status_.adopt(std::move(passed)) : status_.open(directory.address()));
     }
     ~StatusWorld() {
         loop_.stop();
@@ -305,8 +305,8 @@ TEST(PassedAlong, ToAnotherProcessIsNotThePeer) {
 class ServedPort {
 public:
     ServedPort() {
-        EXPECT_EQ(before_.checkIn(), 0);
-        EXPECT_EQ(port_.checkIn(), 0) << "the socket of a daemon that was killed is in nobody's way";
+        EXPECT_FALSE(before_.checkIn());
+        EXPECT_FALSE(port_.checkIn()) << "the socket of a daemon that was killed is in nobody's way";
         EXPECT_TRUE(port_.serve(loop_, [this](const UpcallPacket& packet) { return answer(packet); }));
         thread_ = std::thread([this] { loop_.run(); });
     }
@@ -359,7 +359,7 @@ std::string ask(int socket, const std::string& packet) {
 TEST(UpcallPort, TellsTheSenderAsTheKernelVouches) {
     ServedPort port;
     SeqpacketUpcallPort wrongType(port.test().root(), port.identity, FileDescriptor(::socket(AF_UNIX, SOCK_STREAM, 0)));
-    EXPECT_EQ(wrongType.checkIn(), EINVAL);
+    EXPECT_EQ(wrongType.checkIn().number(), EINVAL);
     EXPECT_TRUE(port.test().item("run/zorvane/com.veltra.zorvaned.upcall").starts_with("other 0600 "));
     const FileDescriptor socket = port.connect();
     ASSERT_TRUE(socket.valid());

@@ -50,9 +50,8 @@ void putReferenced(World& world) {
                               "second:x:502:502::/private/var/second:/bin/sh\n");
     putWithGroup(world, "app", "group.old");
     putGroup(world, "group.old", uuids[0]);
-    ASSERT_EQ(world.sandbox.setMapping(mobile, platform::SandboxItemType::dataContainer, "app",
-                                       world.path(applications + "/" + uuids[0])),
-              0);
+    ASSERT_FALSE(world.sandbox.setMapping(mobile, platform::SandboxItemType::dataContainer, "app",
+                                          world.path(applications + "/" + uuids[0])));
 }
 
 void expectReferenced(World& world) {
@@ -226,7 +225,7 @@ TEST(BootConditions, ALockedFileSystem) {
     world.write(bundleMarker, "");
     world.restart();
     const FoundContainer found = world.make("app");
-    ASSERT_EQ(world.sandbox.setMapping(mobile, platform::SandboxItemType::dataContainer, "app", found.path), 0);
+    ASSERT_FALSE(world.sandbox.setMapping(mobile, platform::SandboxItemType::dataContainer, "app", found.path));
     ASSERT_TRUE(disk.takeKeyAway());
     EXPECT_EQ(codeOf(world.find("app")), ErrorCode::cacheNotRebuilt);
     EXPECT_EQ(codeOf(world.daemonsClient().metadataForUser(

@@ -86,7 +86,7 @@ protected:
     int classOf(const std::string& relative) { return world.protection().classOf(open(relative).get()).value_or(-1); }
     void put(const std::string& file, int protectionClass) {
         world.write(path + file, "x");
-        ASSERT_EQ(world.protection().setClass(open(path + file).get(), protectionClass), 0);
+        ASSERT_FALSE(world.protection().setClass(open(path + file).get(), protectionClass));
     }
     void record(int protectionClass) {
         const plist::Value value(protectionClass);

@@ -3,6 +3,7 @@
 #pragma once
 
 #include "platform/Device.h"
+#include "platform/Errno.h"
 
 #include <atomic>
 #include <functional>
@@ -21,10 +22,10 @@ class FlagBootMarker final : public platform::BootMarker {
 public:
     explicit FlagBootMarker(bool present = false) : state{.present = present, .foreign = false} {}
     [[nodiscard]] State look() const override { return state; }
-    int make() override {
+    Errno make() override {
         if (makeError == 0)
             state = {.present = true, .foreign = false};
-        return makeError;
+        return Errno(makeError);
     }
     void forget() override { state = {}; }
     [[nodiscard]] std::string name() const override { return "marker"; }
@@ -35,14 +36,13 @@ public:
 class SettableLockState final : public platform::DeviceLockState {
 public:
     [[nodiscard]] int currentState() const override { return state; }
-    int registerForChanges(platform::RunLoop&, std::function<void()> changed) override {
+    Errno registerForChanges(platform::RunLoop&, std::function<void()> changed) override {
         notify = std::move(changed);
-        return registrationStatus;
+        return Errno();
     }
     [[nodiscard]] const char* registrationCallName() const override { return "register"; }
     [[nodiscard]] const char* notificationName() const override { return "lockstate"; }
     std::atomic<int> state{0};
-    int registrationStatus = 0;
     std::function<void()> notify;
 };
 

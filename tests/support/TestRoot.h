@@ -51,7 +51,7 @@ public:
     [[nodiscard]] const platform::SystemRoot& root() const {
         if (!root_) {
             root_ = platform::SystemRoot::open(path_).value();
-            errno = root_->makeRuntimeDirectory(disk_);
+            errno = root_->makeRuntimeDirectory(disk_).number();
             checked(errno == 0 ? 0 : -1, "the runtime directory");
         }
         return *root_;

@@ -11,6 +11,7 @@
 #include "daemon/Composition.h"
 #include "daemon/LinuxPlatform.h"
 #include "os/LinuxDisk.h"
+#include "platform/Errno.h"
 #include "store/Names.h"
 #include "support/FaultDisk.h"
 #include "support/RecordingLog.h"
@@ -80,9 +81,9 @@ public:
 /// Passes on what it is told until it is to fail.
 class FailingSandbox final : public platform::SandboxUserState {
 public:
-    int setMapping(std::uint32_t userId, platform::SandboxItemType type, std::string_view identifier,
-                   const std::optional<std::string>& path) override {
-        return !path && removeError != 0 ? removeError : inner->setMapping(userId, type, identifier, path);
+    Errno setMapping(std::uint32_t userId, platform::SandboxItemType type, std::string_view identifier,
+                     const std::optional<std::string>& path) override {
+        return !path && removeError != 0 ? Errno(removeError) : inner->setMapping(userId, type, identifier, path);
     }
     unsigned removeDanglingMappings(const std::function<bool(std::uint32_t)>& mayConclude,
                                     const std::function<bool(const std::string&)>& isGone) override {

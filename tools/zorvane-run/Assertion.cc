@@ -21,8 +21,8 @@ namespace {
 
 namespace platform = zor::platform;
 
-Failure cannotLook(const std::string& path, int number) {
-    return {.what = withReason("cannot look whether the program may be started: " + path, number),
+Failure cannotLook(const std::string& path, zor::Errno error) {
+    return {.what = withReason("cannot look whether the program may be started: " + path, error),
             .advice = "look who owns that directory: it is the daemon's"};
 }
 
@@ -35,13 +35,13 @@ std::string_view reasonIn(int file) {
     return platform::terminationReasonText(static_cast<platform::TerminationReason>(number));
 }
 
-/// 0 when nobody holds the file, EWOULDBLOCK when somebody does, or another errno.
-int tryLock(int file, int operation) {
+/// EWOULDBLOCK when somebody holds the file.
+zor::Errno tryLock(int file, int operation) {
     int result = 0;
     do {
         result = ::flock(file, operation);
     } while (result != 0 && errno == EINTR);
-    return result == 0 ? 0 : errno;
+    return result == 0 ? zor::Errno() : zor::Errno::last();
 }
 
 } // namespace
@@ -59,17 +59,17 @@ Result<Freedom> awaitFreedom(const Root& root, const Options& options) {
             return freedom;
         if (!file)
             return std::unexpected(cannotLook(root.below("/" + relative), file.error()));
-        int failure = tryLock(file->get(), LOCK_SH | LOCK_NB);
+        zor::Errno failure = tryLock(file->get(), LOCK_SH | LOCK_NB);
         if (failure == EWOULDBLOCK && options.wait)
             failure = tryLock(file->get(), LOCK_SH);
-        else if (failure == 0)
+        else if (!failure)
             return freedom; // left by a daemon that was killed
         if (failure == EWOULDBLOCK)
             return std::unexpected(Failure{
                 .what = options.identifier + " may not be started now: " + std::string(reasonIn(file->get())),
                 .advice = "wait until that has ended (a change of data protection ends after the device has been "
                           "unlocked): --wait does, and 'zorvanectl status' shows what is held"});
-        if (failure != 0)
+        if (failure)
             return std::unexpected(cannotLook(root.below("/" + relative), failure));
     }
 }

@@ -2,6 +2,7 @@
 // Why this program could not start another one: what happened and where, and what to do about it.
 #pragma once
 
+#include "platform/Errno.h"
 #include "zorvane/Text.h"
 
 #include <expected>
@@ -18,8 +19,8 @@ struct Failure {
 template <typename T>
 using Result = std::expected<T, Failure>;
 
-/// "WHAT: what the errno means".
-[[nodiscard]] std::string withReason(const std::string& what, int number);
+/// "WHAT: what the error means".
+[[nodiscard]] std::string withReason(const std::string& what, zor::Errno error);
 using zorvane::printable;
 
 // Exit codes of the program's own; any other is that of the program it ran, 128 and the number for a signal.

@@ -101,27 +101,27 @@ int runInside(int argumentCount, char** arguments) {
         !(network = networkNamed(arguments[Argument::networkAt])))
         return say("the option is for the use of zorvane-run itself", exitFailure);
     if (!leaveKeys())
-        return say(withReason("cannot leave the caller's keys", errno), exitFailure);
+        return say(withReason("cannot leave the caller's keys", zor::Errno::last()), exitFailure);
     if (!become(user))
-        return say(withReason("cannot become user " + std::to_string(user), errno), exitFailure);
+        return say(withReason("cannot become user " + std::to_string(user), zor::Errno::last()), exitFailure);
     // As the user: a container may be closed to everybody else.
     const char* const directory = arguments[Argument::directoryAt];
     if (::chdir(directory) != 0)
-        return say(withReason("cannot go to " + std::string(directory), errno), exitFailure);
+        return say(withReason("cannot go to " + std::string(directory), zor::Errno::last()), exitFailure);
     ::umask(usualUmask);
     takeSignals();
     const zor::platform::FileDescriptor self(static_cast<int>(::syscall(SYS_pidfd_open, ::getpid(), 0)));
     if (!self.valid() || !sendDescriptor(channel, self.get()))
-        return say(withReason("cannot report", errno), exitFailure);
+        return say(withReason("cannot report", zor::Errno::last()), exitFailure);
     if (!closeOnExecFrom(STDERR_FILENO + 1))
-        return say(withReason("cannot close descriptors", errno), exitFailure);
+        return say(withReason("cannot close descriptors", zor::Errno::last()), exitFailure);
     if (!fence(*network))
-        return say(withReason("the kernel does not take the rules for system calls", errno), exitFailure);
+        return say(withReason("the kernel does not take the rules for system calls", zor::Errno::last()), exitFailure);
     char** const program = arguments + Argument::programAt;
     ::execvp(program[0], program);
-    const int number = errno;
-    return say(withReason("cannot execute " + std::string(program[0]), number),
-               number == ENOENT || number == ENOTDIR ? exitNotFound : exitCannotExecute);
+    const zor::Errno error = zor::Errno::last();
+    return say(withReason("cannot execute " + std::string(program[0]), error),
+               error == ENOENT || error == ENOTDIR ? exitNotFound : exitCannotExecute);
 }
 
 } // namespace zorvanerun

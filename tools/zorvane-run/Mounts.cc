@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Mounts.h"
 
+#include "base/Try.h"
 #include "fs/MountFences.h"
 #include "os/Openat2.h"
 #include "zorvane/Client.h"
@@ -45,14 +46,14 @@ Failure notFound(const std::string& cannot, const std::string& path, const std::
     return {.what = cannot, .advice = advice};
 }
 
-std::expected<FileDescriptor, int> openPlain(const Root& root, const std::string& path) {
+zor::ErrnoOr<FileDescriptor> openPlain(const Root& root, const std::string& path) {
     const std::string relative = path.substr(root.path == "/" ? 1 : root.path.size() + 1);
     return openBeneath(root.descriptor.get(), relative.c_str(), O_PATH | O_DIRECTORY);
 }
 
 /// A container below the home, if there is one. Whoever owns a directory there can mount a file system that never
 /// answers: none is entered.
-std::expected<FileDescriptor, int> openContainer(const Root& root, const std::string& path, const std::string& home) {
+zor::ErrnoOr<FileDescriptor> openContainer(const Root& root, const std::string& path, const std::string& home) {
     using zor::fs::MountFence;
     const std::size_t begin = root.path == "/" ? 1 : root.path.size() + 1;
     auto opened = home.empty()
@@ -61,11 +62,11 @@ std::expected<FileDescriptor, int> openContainer(const Root& root, const std::st
                             .open(path.c_str() + begin, O_PATH | O_DIRECTORY);
     // A program would find nothing of its own there, and make it anew.
     if (opened && zor::platform::hidesNames(opened->get()))
-        return std::unexpected(ENOKEY);
+        return zor::Errno(ENOKEY);
     return opened;
 }
 
-std::string cannotOpen(const std::string& place, int error) {
+std::string cannotOpen(const std::string& place, zor::Errno error) {
     if (error == EXDEV)
         return place + " is a mount point, or lies behind one";
     if (error == ELOOP)
@@ -93,12 +94,12 @@ public:
         const bool users = kind == Mount::Kind::data || kind == Mount::Kind::applicationGroup;
         auto directory = openContainer(root_, path, users ? home_ : std::string());
         if (!directory && directory.error() == ENOENT)
-            return std::unexpected(notFound(cannotOpen(what + " " + path, ENOENT), path, advice));
+            return std::unexpected(notFound(cannotOpen(what + " " + path, directory.error()), path, advice));
         if (!directory)
             return failed(cannotOpen(what + " " + path, directory.error()), advice);
         struct stat status{};
         if (::fstat(directory->get(), &status) != 0)
-            return failed(withReason(what + " " + path + " cannot be read", errno), advice);
+            return failed(withReason(what + " " + path + " cannot be read", zor::Errno::last()), advice);
         const bool owned =
             users ? status.st_uid == options_.user : status.st_uid == rootUser || status.st_uid == systemUser_;
         if (!S_ISDIR(status.st_mode) || !owned)
@@ -206,16 +207,14 @@ const char* kindName(Mount::Kind kind) {
 
 Result<std::vector<Mount>> openMounts(const Root& root, const Options& options, const ToldContainers& told) {
     // The system is the one that this program runs on, whatever root the daemon has.
-    const auto device = Root::open("/");
-    if (!device)
-        return std::unexpected(device.error());
+    const Root device = TRY(Root::open("/"));
     std::vector<Mount> mounts;
     Collector collector(root, options, told.home, mounts);
-    Result<void> done = collector.operatingSystem(*device);
+    Result<void> done = collector.operatingSystem(device);
     const std::vector<std::string> containers = pathsOf(told);
     for (const std::string& path : options.readOnly)
         if (done)
-            done = collector.readOnly(*device, path, containers);
+            done = collector.readOnly(device, path, containers);
     if (done)
         done = collector.container(Mount::Kind::data, options.identifier, told.data);
     if (done)
@@ -224,8 +223,7 @@ Result<std::vector<Mount>> openMounts(const Root& root, const Options& options, 
         done = collector.container(Mount::Kind::systemContainer, options.identifier, *told.systemContainer);
     if (done)
         done = collector.groups(Mount::Kind::systemGroup, told.systemGroups);
-    if (!done)
-        return std::unexpected(done.error());
+    TRY(std::move(done));
     return mounts;
 }
 

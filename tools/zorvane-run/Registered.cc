@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Registered.h"
 
+#include "base/Try.h"
 #include "zorvane/Client.h"
 
 namespace zorvanerun {
@@ -89,18 +90,12 @@ Result<WantedContainers> chooseContainers(const Options& options) {
     const auto system = client->systemGroupContainerPaths(options.identifier);
     if (!system)
         return std::unexpected(failureOf(system.error(), what));
-    auto applicationGroups = choose(*application, options.applicationGroups, "application", "--app-group", options);
-    if (!applicationGroups)
-        return std::unexpected(applicationGroups.error());
-    auto systemGroups = choose(*system, options.systemGroups, "system", "--system-group", options);
-    if (!systemGroups)
-        return std::unexpected(systemGroups.error());
-    const auto systemContainer = chooseSystemContainer(*client, options);
-    if (!systemContainer)
-        return std::unexpected(systemContainer.error());
-    return WantedContainers{.applicationGroups = std::move(*applicationGroups),
-                            .systemGroups = std::move(*systemGroups),
-                            .systemContainer = *systemContainer};
+    auto applicationGroups =
+        TRY(choose(*application, options.applicationGroups, "application", "--app-group", options));
+    auto systemGroups = TRY(choose(*system, options.systemGroups, "system", "--system-group", options));
+    return WantedContainers{.applicationGroups = std::move(applicationGroups),
+                            .systemGroups = std::move(systemGroups),
+                            .systemContainer = TRY(chooseSystemContainer(*client, options))};
 }
 
 } // namespace zorvanerun

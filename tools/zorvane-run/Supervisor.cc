@@ -42,8 +42,8 @@ sigset_t signalSet() {
     return set;
 }
 
-Failure failure(const std::string& what, int number) {
-    return {.what = withReason(what, number), .advice = "see what limits this process"};
+Failure failure(const std::string& what, zor::Errno error) {
+    return {.what = withReason(what, error), .advice = "see what limits this process"};
 }
 
 int exitCodeOf(int status) {
@@ -142,7 +142,7 @@ private:
         ::execve(arguments[0], arguments.data(), environment.data());
         failed = arguments[0];
     }
-    std::fprintf(stderr, "zorvane-run: %s\n", printable(withReason(failed, errno)).c_str());
+    std::fprintf(stderr, "zorvane-run: %s\n", printable(withReason(failed, zor::Errno::last())).c_str());
     ::_exit(exitFailure);
 }
 
@@ -169,10 +169,10 @@ private:
 Result<int> runSandboxed(const Options& options, const std::vector<Mount>& mounts, const ToldContainers& told) {
     const FileDescriptor program(::open("/proc/self/exe", O_PATH | O_CLOEXEC));
     if (!program.valid())
-        return std::unexpected(failure("cannot open this program", errno));
+        return std::unexpected(failure("cannot open this program", zor::Errno::last()));
     int ends[2] = {};
     if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends) != 0)
-        return std::unexpected(failure("cannot make a socket", errno));
+        return std::unexpected(failure("cannot make a socket", zor::Errno::last()));
     FileDescriptor channel(ends[0]);
     FileDescriptor inner(ends[1]);
     // A caller that ignores the end of its children would leave nothing to wait for, here and in the sandbox's maker.
@@ -181,7 +181,7 @@ Result<int> runSandboxed(const Options& options, const std::vector<Mount>& mount
     ::sigaddset(&caught, SIGCHLD);
     FileDescriptor signals(::signalfd(-1, &caught, SFD_CLOEXEC | SFD_NONBLOCK));
     if (!signals.valid() || ::sigprocmask(SIG_BLOCK, &caught, nullptr) != 0)
-        return std::unexpected(failure("cannot catch signals", errno));
+        return std::unexpected(failure("cannot catch signals", zor::Errno::last()));
     const InsideHandles handles{.program = program.get(), .channel = inner.get()};
     std::vector<std::string> arguments = sandboxArguments(options, mounts, told, handles);
     std::vector<std::string> environment = sandboxEnvironment(options, told);
@@ -190,10 +190,10 @@ Result<int> runSandboxed(const Options& options, const std::vector<Mount>& mount
     const FileDescriptor self(static_cast<int>(::syscall(SYS_pidfd_open, ::getpid(), 0)));
     // For what is started from here on, not for this process.
     if (!self.valid() || ::unshare(CLONE_NEWPID) != 0)
-        return std::unexpected(failure("cannot make a namespace of processes", errno));
+        return std::unexpected(failure("cannot make a namespace of processes", zor::Errno::last()));
     const pid_t keeper = ::fork();
     if (keeper < 0)
-        return std::unexpected(failure("cannot make a process", errno));
+        return std::unexpected(failure("cannot make a process", zor::Errno::last()));
     if (keeper == 0) {
         const pid_t maker = ::fork();
         if (maker == 0)

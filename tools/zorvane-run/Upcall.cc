@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Upcall.h"
 
+#include "base/Try.h"
 #include "ipc/Names.h"
 #include "os/Openat2.h"
 
@@ -42,7 +43,7 @@ Result<FileDescriptor> connectTo(const Root& root) {
         return failed(withReason("cannot reach zorvaned at " + path, directory.error()), advice);
     FileDescriptor socket(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
     if (!socket.valid())
-        return failed(withReason("cannot make a socket", errno), "see what limits this process");
+        return failed(withReason("cannot make a socket", zor::Errno::last()), "see what limits this process");
     // Through the open directory no path is too long for an address.
     const std::string shortPath =
         "/proc/self/fd/" + std::to_string(directory->get()) + "/" + std::string(ipc::upcallServiceName);
@@ -53,7 +54,7 @@ Result<FileDescriptor> connectTo(const Root& root) {
     (void)::setsockopt(socket.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
     (void)::setsockopt(socket.get(), SOL_SOCKET, SO_SNDTIMEO, &patience, sizeof patience);
     if (::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0)
-        return failed(withReason("cannot reach zorvaned at " + path, errno), advice);
+        return failed(withReason("cannot reach zorvaned at " + path, zor::Errno::last()), advice);
     ucred server{};
     socklen_t length = sizeof server;
     if (::getsockopt(socket.get(), SOL_SOCKET, SO_PEERCRED, &server, &length) != 0 || server.uid != 0)
@@ -64,14 +65,14 @@ Result<FileDescriptor> connectTo(const Root& root) {
 
 Result<std::vector<std::uint8_t>> exchange(int socket, const std::vector<std::uint8_t>& request) {
     if (::send(socket, request.data(), request.size(), MSG_NOSIGNAL) != static_cast<ssize_t>(request.size()))
-        return failed(withReason("cannot send to zorvaned", errno), seeLog);
+        return failed(withReason("cannot send to zorvaned", zor::Errno::last()), seeLog);
     std::vector<std::uint8_t> reply(replyBytesMax);
     ssize_t bytes = 0;
     do {
         bytes = ::recv(socket, reply.data(), reply.size(), MSG_TRUNC);
     } while (bytes < 0 && errno == EINTR);
     if (bytes < 0)
-        return failed(withReason("zorvaned does not answer the upcall", errno), seeLog);
+        return failed(withReason("zorvaned does not answer the upcall", zor::Errno::last()), seeLog);
     if (bytes == 0)
         return failed("zorvaned ended the upcall's connection", seeLog);
     if (static_cast<std::size_t>(bytes) > reply.size())
@@ -97,13 +98,9 @@ Result<ToldContainers> askForContainers(const Root& root, const Options& options
     if (buffer.empty() || request.size() > requestBytesMax)
         return failed("the request for the containers of " + options.identifier + " is too large",
                       "name fewer groups with --app-group and --system-group");
-    const auto socket = connectTo(root);
-    if (!socket)
-        return std::unexpected(socket.error());
-    const auto packet = exchange(socket->get(), request);
-    if (!packet)
-        return std::unexpected(packet.error());
-    const auto reply = upcall::decodeReply(*packet);
+    const FileDescriptor socket = TRY(connectTo(root));
+    const auto packet = TRY(exchange(socket.get(), request));
+    const auto reply = upcall::decodeReply(packet);
     if (!reply)
         return failed("what came back from the upcall is no reply", "check that daemon and program are of one version");
     if (reply->returnCode != upcall::ReturnCode::success)

@@ -5,6 +5,7 @@
 // Files that are there stay as they are, so a run that was stopped anywhere is finished by the next one: each file
 // appears whole, each directory is given to its owner as long as it is empty. No link is followed below the root.
 #include "Commands.h"
+#include "base/Try.h"
 #include "fs/AtomicFile.h"
 #include "identity/LinuxPasswordDatabase.h"
 #include "identity/UserConfiguration.h"
@@ -23,6 +24,8 @@
 #include <unistd.h>
 
 namespace zorvanectl {
+
+using zor::Errno;
 
 namespace {
 
@@ -49,8 +52,8 @@ std::unexpected<Wrong> wrong(std::string what, std::string advice) {
     return std::unexpected(Wrong{.what = std::move(what), .advice = std::move(advice)});
 }
 
-std::unexpected<Wrong> cannot(const std::string& what, int error) {
-    return wrong("cannot " + what + ": " + ::strerrordesc_np(error),
+std::unexpected<Wrong> cannot(const std::string& what, Errno error) {
+    return wrong("cannot " + what + ": " + error.text(),
                  "look at what lies there, and run this command again as the owner of the root");
 }
 
@@ -114,7 +117,7 @@ Outcome<void> Maker::makeDirectory(const std::string& path, mode_t mode, uid_t o
     const std::string name = path.substr(slash == path.npos ? 0 : slash + 1);
     const int made = disk_.makeDirectory(parent->get(), name.c_str(), mode);
     if (made != 0 && made != -EEXIST)
-        return cannot("make " + shown, -made);
+        return cannot("make " + shown, Errno(-made));
     const auto directory = openBeneath(parent->get(), name.c_str(), O_RDONLY | O_DIRECTORY);
     if (!directory)
         return cannot("open " + shown, directory.error());
@@ -126,7 +129,7 @@ Outcome<void> Maker::makeDirectory(const std::string& path, mode_t mode, uid_t o
     if (failed == 0)
         failed = disk_.sync(parent->get());
     if (failed != 0)
-        return cannot("give " + shown + " its owner and mode", -failed);
+        return cannot("give " + shown + " its owner and mode", Errno(-failed));
     made_.push_back("made " + shown);
     return {};
 }
@@ -139,7 +142,7 @@ Outcome<void> Maker::makeFile(const std::string& directory, const std::string& n
     if (const int failed =
             zor::fs::replaceFileDurably(disk_, opened->get(), name, fileMode,
                                         {reinterpret_cast<const std::uint8_t*>(content.data()), content.size()}))
-        return cannot("write " + shown, -failed);
+        return cannot("write " + shown, Errno(-failed));
     made_.push_back("wrote " + shown);
     return {};
 }
@@ -178,8 +181,7 @@ Outcome<void> Maker::makeConfiguration(const std::optional<zor::platform::Passwo
                         std::to_string(std::min(entry->uid + mobileUsers - 1, zor::ipc::UserNumbers::configuredMax)) +
                         "\n";
         if (!settings.empty())
-            if (auto written = makeFile("etc/zorvane", "zorvaned.conf", "[users]\n" + settings); !written)
-                return written;
+            TRY(makeFile("etc/zorvane", "zorvaned.conf", "[users]\n" + settings));
     }
     const auto configured = zor::platform::configuredUsers(root_, passwords_);
     if (!configured)
@@ -191,10 +193,8 @@ Outcome<void> Maker::makeConfiguration(const std::optional<zor::platform::Passwo
                      "set first= and last= in section [users] of " + root_.path(names::configurationFile));
     // The installer's number is known from here on.
     for (const zor::RootDirectory& directory : zor::rootDirectories)
-        if (auto made = makeDirectory(std::string(directory.path), directory.mode,
-                                      directory.isInstallers ? configured->numbers.installer : ::geteuid());
-            !made)
-            return made;
+        TRY(makeDirectory(std::string(directory.path), directory.mode,
+                          directory.isInstallers ? configured->numbers.installer : ::geteuid()));
     return {};
 }
 
@@ -209,8 +209,7 @@ Outcome<void> Maker::makeHome(const zor::platform::PasswordEntry& entry) {
         return {};
     }
     for (auto slash = path.find('/'); slash != path.npos; slash = path.find('/', slash + 1))
-        if (auto made = makeDirectory(path.substr(0, slash), directoryMode, ::geteuid()); !made)
-            return made;
+        TRY(makeDirectory(path.substr(0, slash), directoryMode, ::geteuid()));
     return makeDirectory(path, directoryMode, entry.uid);
 }
 
@@ -230,11 +229,9 @@ Outcome<void> Maker::registerPrograms() {
     const std::string own = ownProgram();
     if (own.empty())
         return wrong("this program cannot find its own path", "mount /proc");
-    if (auto done = register_("zorvanectl", own,
-                              "    <key>Entitlements</key>\n    <dict>\n        "
-                              "<key>com.veltra.private.Zorvane.allowed</key>\n        <true/>\n    </dict>\n");
-        !done)
-        return done;
+    TRY(register_("zorvanectl", own,
+                  "    <key>Entitlements</key>\n    <dict>\n        "
+                  "<key>com.veltra.private.Zorvane.allowed</key>\n        <true/>\n    </dict>\n"));
     const std::string folder = own.substr(0, own.rfind('/'));
     const std::string beside = folder.substr(0, folder.rfind('/')) + "/sbin";
     for (const std::string& place : {folder, beside}) {
@@ -249,18 +246,12 @@ Outcome<void> Maker::registerPrograms() {
 
 Outcome<void> Maker::make(const std::string& account) {
     for (const char* directory : {"etc", "etc/zorvane", names::identityDirectory})
-        if (auto made = makeDirectory(directory, directoryMode, ::geteuid()); !made)
-            return made;
-    if (auto made = makeUserDatabase(account.empty() ? usualAccount : account); !made)
-        return made;
-    const auto entry = lookUp(account);
-    if (!entry)
-        return std::unexpected(entry.error());
-    if (auto made = makeConfiguration(*entry); !made)
-        return made;
-    if (*entry)
-        if (auto made = makeHome(**entry); !made)
-            return made;
+        TRY(makeDirectory(directory, directoryMode, ::geteuid()));
+    TRY(makeUserDatabase(account.empty() ? usualAccount : account));
+    const auto entry = TRY(lookUp(account));
+    TRY(makeConfiguration(entry));
+    if (entry)
+        TRY(makeHome(*entry));
     return registerPrograms();
 }
 
@@ -269,13 +260,13 @@ Outcome<zor::platform::SystemRoot> openRoot(const std::string& directory) {
     zor::platform::LinuxDisk disk;
     if (const int failed = disk.makeDirectory(AT_FDCWD, directory.c_str(), directoryMode);
         failed != 0 && failed != -EEXIST)
-        return cannot("make the root " + directory, -failed);
+        return cannot("make the root " + directory, Errno(-failed));
     auto root = zor::platform::SystemRoot::open(directory);
     if (!root)
         return cannot("open the root " + directory, root.error());
     struct stat status{};
     if (::fstat(root->descriptor(), &status) != 0)
-        return cannot("look at the root " + directory, errno);
+        return cannot("look at the root " + directory, Errno::last());
     if (status.st_uid != ::geteuid())
         return wrong("the root " + directory + " belongs to user " + std::to_string(status.st_uid),
                      "run this command as that user");

@@ -15,7 +15,7 @@ using zor::platform::FileDeviceLockState;
 
 bool deviceIsLocked(const std::string& directory) {
     auto root = zor::platform::SystemRoot::open(directory);
-    return root && root->openRuntimeDirectory() == 0 &&
+    return root && !root->openRuntimeDirectory() &&
            FileDeviceLockState(*root).currentState() == FileDeviceLockState::locked;
 }
 

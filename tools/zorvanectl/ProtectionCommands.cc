@@ -3,6 +3,7 @@
 #include "Commands.h"
 #include "KnownContainer.h"
 #include "PendingChanges.h"
+#include "base/Try.h"
 #include "device/FileDeviceLockState.h"
 #include "device/XattrProtectionClass.h"
 #include "os/FileDescriptor.h"
@@ -22,6 +23,7 @@
 namespace zorvanectl {
 
 namespace names = zor::platform::names;
+using zor::Errno;
 using zor::platform::defaultProtectionClass;
 using zor::platform::FileDescriptor;
 using zor::platform::FileDeviceLockState;
@@ -38,7 +40,7 @@ std::string classOnDisk(int directory) {
     for (const char* attribute : {names::protectionAttribute, names::protectionAttributeUser}) {
         const auto found = XattrProtectionClass::classIn(directory, attribute);
         if (!found)
-            return ::strerrordesc_np(found.error());
+            return found.error().text();
         if (*found)
             return std::to_string(**found);
     }
@@ -47,11 +49,9 @@ std::string classOnDisk(int directory) {
 
 /// Of each directory that lies in the container.
 content::Outcome<std::map<std::string, std::string>> classesOnDisk(const std::string& path, std::uint64_t kind) {
-    auto container = content::openToldContainer(path, fenceKind(kind));
-    if (!container)
-        return std::unexpected(container.error());
+    FileDescriptor container = TRY(content::openToldContainer(path, fenceKind(kind)));
     std::map<std::string, std::string> classes;
-    const int fd = container->release();
+    const int fd = container.release();
     const std::unique_ptr<DIR, int (*)(DIR*)> entries(::fdopendir(fd), ::closedir);
     if (!entries) {
         ::close(fd);
@@ -96,28 +96,26 @@ int showProtection(const Output& output, const zorvane::Client::Address& address
     return exitDone;
 }
 
-zorvane::Error unreachable(const std::string& what, int number) {
-    return {.kind = zorvane::Error::Kind::unreachable,
-            .code = 0,
-            .message = printable(what) + ": " + ::strerrordesc_np(number)};
+zorvane::Error unreachable(const std::string& what, Errno error) {
+    return {.kind = zorvane::Error::Kind::unreachable, .code = 0, .message = printable(what) + ": " + error.text()};
 }
 
-/// 0 or an errno. By rename, so that nobody reads half a state.
-int writeLockState(int directory, int state) {
+/// By rename, so that nobody reads half a state.
+Errno writeLockState(int directory, int state) {
     const std::string temporary = std::string(".") + names::lockState;
     const std::string text = std::to_string(state) + "\n";
     (void)::unlinkat(directory, temporary.c_str(), 0);
     const FileDescriptor file(
         ::openat(directory, temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0644));
     if (!file.valid())
-        return errno;
+        return Errno::last();
     const ssize_t written = ::write(file.get(), text.data(), text.size());
     if (written >= 0 && written < static_cast<ssize_t>(text.size()))
-        return ENOSPC;
+        return Errno(ENOSPC);
     if (written < 0 || ::fchmod(file.get(), 0644) != 0 ||
         ::renameat(directory, temporary.c_str(), directory, names::lockState) != 0)
-        return errno;
-    return 0;
+        return Errno::last();
+    return Errno();
 }
 
 } // namespace
@@ -182,10 +180,10 @@ int lockState(const zorvane::ConnectOptions& connect, const Output& output, cons
         return output.localError(exitUsage, "the lock state of a device is the device's to set",
                                  "name another root with --root", what);
     const std::string directory = root->path(names::runtimeDirectory);
-    if (const int failure = root->openRuntimeDirectory())
+    if (const Errno failure = root->openRuntimeDirectory())
         return output.error(unreachable(directory + " cannot be opened", failure), what);
     if (state)
-        if (const int failure = writeLockState(root->runtimeDirectory(), *state))
+        if (const Errno failure = writeLockState(root->runtimeDirectory(), *state))
             return output.error(unreachable(directory + " cannot be written to", failure), what);
     const int now = FileDeviceLockState(*root).currentState();
     if (output.isJson())

@@ -95,9 +95,8 @@ bool isWhole(const RegistryReport& report) {
     });
 }
 
-int cannotOpenRoot(const Output& output, const std::string& root, int error, const std::string& what) {
-    return output.localError(exitLocalError,
-                             "the root " + printable(root) + " cannot be opened: " + ::strerrordesc_np(error),
+int cannotOpenRoot(const Output& output, const std::string& root, zor::Errno error, const std::string& what) {
+    return output.localError(exitLocalError, "the root " + printable(root) + " cannot be opened: " + error.text(),
                              "name the daemon's root with --root", what);
 }
 
@@ -133,10 +132,9 @@ int registryCheck(const Output& output, const std::string& path) {
     const zor::platform::FileDescriptor file(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
     const auto bytes = file.valid()
                            ? zor::platform::readSmallFile(file.get(), zor::platform::RegistryDirectory::fileBytesMax)
-                           : std::unexpected(errno);
+                           : zor::Errno::last();
     if (!bytes)
-        return output.localError(exitLocalError,
-                                 printable(path) + " cannot be read: " + ::strerrordesc_np(bytes.error()),
+        return output.localError(exitLocalError, printable(path) + " cannot be read: " + bytes.error().text(),
                                  "name a file of the registry, or one that is to become one", what);
     const RegistryFileReport report = zor::platform::reportRegistryFile(path, *bytes);
     if (output.isJson())

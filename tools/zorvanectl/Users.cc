@@ -7,7 +7,6 @@
 #include "zorvane/Client.h"
 
 #include <cerrno>
-#include <cstring>
 
 namespace zorvanectl {
 
@@ -17,9 +16,9 @@ using zor::platform::LinuxPasswordDatabase;
 using zor::platform::PasswordEntry;
 using zor::platform::SystemRoot;
 
-std::expected<PasswordEntry, int> entryFor(const std::string& root, std::uint32_t number) {
+zor::ErrnoOr<PasswordEntry> entryFor(const std::string& root, std::uint32_t number) {
     const auto opened = SystemRoot::open(root);
-    return opened ? LinuxPasswordDatabase(*opened).entryForUserId(number) : std::unexpected(opened.error());
+    return opened ? LinuxPasswordDatabase(*opened).entryForUserId(number) : opened.error();
 }
 
 } // namespace
@@ -29,7 +28,7 @@ std::expected<std::uint32_t, std::string> userNumber(const std::string& root, co
         return zorvane::currentMobileUser;
     const auto opened = SystemRoot::open(root);
     if (!opened)
-        return std::unexpected("the root " + root + " cannot be opened: " + ::strerrordesc_np(opened.error()));
+        return std::unexpected("the root " + root + " cannot be opened: " + opened.error().text());
     return zor::platform::userNumberOf(*opened, text);
 }
 

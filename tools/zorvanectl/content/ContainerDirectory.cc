@@ -51,7 +51,7 @@ Outcome<FileDescriptor> openToldContainer(const std::string& path, MountFence::K
         return notOpened(path, errno);
     auto container = MountFence(root.get(), place.substr(1), kind).open(path.c_str() + 1, O_RDONLY | O_DIRECTORY);
     if (!container)
-        return notOpened(path, container.error());
+        return notOpened(path, container.error().number());
     return std::move(*container);
 }
 

@@ -39,7 +39,7 @@ Outcome<SealedDirectory> SealedDirectory::make(zor::platform::Disk& disk, int co
         return failed("the container cannot be written to", -made);
     auto directory = zor::platform::openBeneathOnMount(container, name.data(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!directory)
-        return failed("the new content's directory cannot be opened", directory.error());
+        return failed("the new content's directory cannot be opened", directory.error().number());
     if (!zor::fs::isFreshDirectory(directory->get()))
         return failed("somebody put something else in the place of the new content's directory");
     sealed.directory_ = std::move(*directory);

@@ -2,6 +2,7 @@
 #include "Unpacker.h"
 
 #include "ItemRules.h"
+#include "base/Try.h"
 #include "os/Openat2.h"
 #include "zorvane/Text.h"
 
@@ -37,27 +38,23 @@ std::unexpected<Failure> refused(std::string_view name, std::string_view reason)
 
 Outcome<std::uint32_t> Unpacker::unpack(int records) {
     for (;;) {
-        const auto head = take(records, sizeof(Record));
-        if (!head)
-            return std::unexpected(head.error());
+        const auto head = TRY(take(records, sizeof(Record)));
         Record record;
-        std::memcpy(&record, head->data(), sizeof record);
+        std::memcpy(&record, head.data(), sizeof record);
         const bool named = record.kind == RecordKind::entry;
         if (record.first > recordBytesMax || record.second > (named ? recordBytesMax - record.first : 0))
             return failed("the archive's decoder sends nonsense");
-        const auto bytes = take(records, std::size_t{record.first} + record.second);
-        if (!bytes)
-            return std::unexpected(bytes.error());
+        const auto bytes = TRY(take(records, std::size_t{record.first} + record.second));
         course_.readTo(record.readBytes);
         Outcome<void> done;
         switch (record.kind) {
         case RecordKind::entry:
             done = finishFile();
             if (done)
-                done = beginEntry(record, textOf(bytes->first(record.first)), textOf(bytes->subspan(record.first)));
+                done = beginEntry(record, textOf(bytes.first(record.first)), textOf(bytes.subspan(record.first)));
             break;
         case RecordKind::data:
-            done = writeData(record, *bytes);
+            done = writeData(record, bytes);
             break;
         case RecordKind::end:
             done = finishFile();
@@ -65,12 +62,11 @@ Outcome<std::uint32_t> Unpacker::unpack(int records) {
                 return record.flags;
             break;
         case RecordKind::failure:
-            return content::refused("the archive cannot be read: " + zorvane::printable(std::string(textOf(*bytes))));
+            return content::refused("the archive cannot be read: " + zorvane::printable(std::string(textOf(bytes))));
         default:
             return failed("the archive's decoder sends nonsense");
         }
-        if (!done)
-            return std::unexpected(done.error());
+        TRY(std::move(done));
     }
 }
 
@@ -83,8 +79,7 @@ Outcome<void> Unpacker::fill(int records, std::size_t bytes) {
     }
     while (end_ - begin_ < bytes) {
         const ssize_t count = ::read(records, buffer_.data() + end_, buffer_.size() - end_);
-        if (auto stopped = course_.checkStopped(); !stopped)
-            return stopped;
+        TRY(course_.checkStopped());
         if (count < 0 && errno == EINTR)
             continue;
         if (count < 0)
@@ -99,8 +94,7 @@ Outcome<void> Unpacker::fill(int records, std::size_t bytes) {
 
 /// Good until the next call.
 Outcome<std::span<const std::uint8_t>> Unpacker::take(int records, std::size_t bytes) {
-    if (auto filled = fill(records, bytes); !filled)
-        return std::unexpected(filled.error());
+    TRY(fill(records, bytes));
     const std::span<const std::uint8_t> taken = std::span(buffer_).subspan(begin_, bytes);
     begin_ += bytes;
     return taken;
@@ -123,18 +117,16 @@ Outcome<void> Unpacker::beginEntry(const Record& record, std::string_view name, 
     const mode_t mode = hardLink ? S_IFREG : static_cast<mode_t>(record.mode);
     if (const auto why = whyRefused({.name = entry_.name, .mode = mode, .linkTarget = target}))
         return refused(entry_.name, *why);
-    auto place = placeOf(entry_.name);
-    if (!place)
-        return std::unexpected(place.error());
+    const Place place = TRY(placeOf(entry_.name));
     Outcome<void> made;
     if (hardLink)
-        made = makeHardLink(*place);
+        made = makeHardLink(place);
     else if (S_ISDIR(mode))
-        made = makeDirectory(place->directory, place->name, (mode & accessBits) | S_IRWXU);
+        made = makeDirectory(place.directory, place.name, (mode & accessBits) | S_IRWXU);
     else if (S_ISLNK(mode))
-        made = makeSymbolicLink(*place);
+        made = makeSymbolicLink(place);
     else
-        made = makeFile(*place);
+        made = makeFile(place);
     return made ? course_.addItem() : made;
 }
 
@@ -146,12 +138,11 @@ Outcome<Unpacker::Place> Unpacker::placeOf(const std::string& name) {
         constexpr int flags = O_PATH | O_DIRECTORY | O_NOFOLLOW;
         auto opened = openBeneathOnMount(directory_, parent.c_str(), flags);
         if (!opened && opened.error() == ENOENT) {
-            if (auto made = makeParents(parent); !made)
-                return std::unexpected(made.error());
+            TRY(makeParents(parent));
             opened = openBeneathOnMount(directory_, parent.c_str(), flags);
         }
         if (!opened)
-            return cannotMake(opened.error());
+            return cannotMake(opened.error().number());
         parent_ = std::move(*opened);
         parentPath_ = parent;
     }
@@ -174,7 +165,7 @@ Outcome<void> Unpacker::makeParents(const std::string& path) {
             below = openBeneathOnMount(parent, name.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
         }
         if (!below)
-            return cannotMake(below.error());
+            return cannotMake(below.error().number());
         current = std::move(*below);
     }
     return {};
@@ -186,7 +177,8 @@ Outcome<void> Unpacker::makeDirectory(int parent, const std::string& name, mode_
         return cannotMake(-made);
     const auto directory = openBeneathOnMount(parent, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!directory)
-        return cannotMake(directory.error() == ENOTDIR || directory.error() == ELOOP ? EEXIST : directory.error());
+        return cannotMake(directory.error() == ENOTDIR || directory.error() == ELOOP ? EEXIST
+                                                                                     : directory.error().number());
     if (const int owned = disk_.changeOwner(directory->get(), owner_.user, owner_.group); owned < 0)
         return cannotMake(-owned);
     if (const int moded = disk_.changeMode(directory->get(), mode); moded < 0)
@@ -281,7 +273,7 @@ Outcome<void> Unpacker::makeHardLink(const Place& place) {
         return refused(entry_.name, "the data of its file comes twice");
     auto file = openBeneathOnMount(place.directory, place.name.c_str(), O_WRONLY | O_NOFOLLOW);
     if (!file)
-        return cannotMake(file.error());
+        return cannotMake(file.error().number());
     file_ = std::move(*file);
     fileEnd_ = 0;
     return {};
