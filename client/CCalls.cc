@@ -2,6 +2,7 @@
 // Calls of the C interface that wait, their errors and results, and what needs no daemon.
 #include "CInterface.h"
 
+#include "base/Try.h"
 #include "plist/Text.h"
 
 #include <algorithm>
@@ -84,12 +85,8 @@ ConnectOptions connectOptions(const char* root, std::int64_t timeoutMilliseconds
 }
 
 Result<Client*> Session::client() {
-    if (!client_) {
-        auto connected = Client::connect(options_);
-        if (!connected)
-            return std::unexpected(connected.error());
-        client_ = std::move(*connected);
-    }
+    if (!client_)
+        client_ = TRY(Client::connect(options_));
     return &*client_;
 }
 

@@ -2,6 +2,7 @@
 // Requests of the C interface: each judges and copies its arguments, and says which call of the client carries it out.
 #include "CInterface.h"
 
+#include "base/Try.h"
 #include "plist/Text.h"
 
 #include <utility>
@@ -27,12 +28,7 @@ zorvane_request* prepared(Build&& build) noexcept {
 
 template <typename Call>
 Run onClient(Call&& call) {
-    return [call = std::forward<Call>(call)](Session& session) -> Outcome {
-        const auto client = session.client();
-        if (!client)
-            return std::unexpected(client.error());
-        return call(**client);
-    };
+    return [call = std::forward<Call>(call)](Session& session) -> Outcome { return call(*TRY(session.client())); };
 }
 
 std::string textOf(const char* text, const char* whenMissing) {
@@ -73,18 +69,16 @@ bool has(std::uint32_t flags, std::uint32_t flag) {
 }
 
 Outcome nothingOf(const Result<void>& result) {
-    if (!result)
-        return std::unexpected(result.error());
+    TRY(result);
     return zorvane_result{};
 }
 
 /// The answer that `fill` makes of the client's.
 template <typename T, typename Fill>
 Outcome resultOf(Result<T>&& answer, Fill&& fill) {
-    if (!answer)
-        return std::unexpected(std::move(answer.error()));
+    T value = TRY(std::move(answer));
     zorvane_result result;
-    fill(result, std::move(*answer));
+    fill(result, std::move(value));
     return result;
 }
 

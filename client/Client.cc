@@ -3,6 +3,7 @@
 #include "zorvane/Client.h"
 
 #include "Connection.h"
+#include "base/Try.h"
 #include "ipc/ContainerClasses.h"
 #include "ipc/Keys.h"
 #include "ipc/UUID.h"
@@ -116,16 +117,14 @@ plist::Dictionary addressed(ipc::Command command, const Client::Address& address
     return message;
 }
 
-Result<void> withoutContent(const Result<plist::Dictionary>& reply) {
-    if (!reply)
-        return std::unexpected(reply.error());
+Result<void> withoutContent(Result<plist::Dictionary> reply) {
+    (void)TRY(std::move(reply));
     return {};
 }
 
-Result<std::string> pathIn(const Result<plist::Dictionary>& reply) {
-    if (!reply)
-        return std::unexpected(reply.error());
-    const std::string* path = reply->string(keys::replyPath);
+Result<std::string> pathIn(Result<plist::Dictionary> answer) {
+    const plist::Dictionary reply = TRY(std::move(answer));
+    const std::string* path = reply.string(keys::replyPath);
     if (!path)
         return incomplete();
     return *path;
@@ -147,10 +146,9 @@ bool appendListed(const plist::Dictionary& reply, std::vector<ListedContainer>& 
     return true;
 }
 
-Result<Client::GroupPaths> groupPathsIn(const Result<plist::Dictionary>& reply) {
-    if (!reply)
-        return std::unexpected(reply.error());
-    const plist::Dictionary* groups = reply->dictionary(keys::replyGroupContainerDict);
+Result<Client::GroupPaths> groupPathsIn(Result<plist::Dictionary> answer) {
+    const plist::Dictionary reply = TRY(std::move(answer));
+    const plist::Dictionary* groups = reply.dictionary(keys::replyGroupContainerDict);
     if (!groups)
         return incomplete();
     Client::GroupPaths paths;
@@ -203,10 +201,7 @@ Client& Client::operator=(Client&&) noexcept = default;
 Client::~Client() = default;
 
 Result<Client> Client::connect(const ConnectOptions& options) {
-    auto connection = Connection::open(options, Connection::Service::commands);
-    if (!connection)
-        return std::unexpected(connection.error());
-    return Client(std::make_unique<Connection>(std::move(*connection)));
+    return Client(std::make_unique<Connection>(TRY(Connection::open(options, Connection::Service::commands))));
 }
 
 Result<Container> Client::createOrLookup(const Lookup& lookup) {
@@ -216,16 +211,14 @@ Result<Container> Client::createOrLookup(const Lookup& lookup) {
     setIdentifier(message, lookup.identifier);
     message.set(keys::createIfNecessary, lookup.create);
     message.set(keys::transient, lookup.transient);
-    const auto reply = connection_->call(message);
-    if (!reply)
-        return std::unexpected(reply.error());
-    const auto uuid = zor::UUID::of(*reply, keys::replyUUID);
-    const std::string* identifier = reply->string(keys::replyIdentifier);
-    const std::string* path = reply->string(keys::replyPath);
+    const plist::Dictionary reply = TRY(connection_->call(message));
+    const auto uuid = zor::UUID::of(reply, keys::replyUUID);
+    const std::string* identifier = reply.string(keys::replyIdentifier);
+    const std::string* path = reply.string(keys::replyPath);
     if (!uuid || !identifier || !path)
         return incomplete();
     return Container{
-        .uuid = uuid->bytes(), .identifier = *identifier, .path = *path, .existed = reply->isTrue(keys::replyExisted)};
+        .uuid = uuid->bytes(), .identifier = *identifier, .path = *path, .existed = reply.isTrue(keys::replyExisted)};
 }
 
 Result<Client::Page> Client::listPage(std::uint64_t containerClass, std::uint32_t user, bool transient,
@@ -235,14 +228,12 @@ Result<Client::Page> Client::listPage(std::uint64_t containerClass, std::uint32_
     message.set(keys::userId, user);
     message.set(keys::transient, transient);
     message.set(keys::pageAfter, after);
-    const auto reply = connection_->call(message);
-    if (!reply)
-        return std::unexpected(reply.error());
+    const plist::Dictionary reply = TRY(connection_->call(message));
     Page page;
-    if (!appendListed(*reply, page.containers))
+    if (!appendListed(reply, page.containers))
         return incomplete();
     // A daemon that knows no pages answers with the whole list, and names no next one.
-    if (const std::string* next = reply->string(keys::replyNextPage)) {
+    if (const std::string* next = reply.string(keys::replyNextPage)) {
         if (*next <= after) // the list would never end
             return incomplete();
         page.next = *next;
@@ -253,12 +244,10 @@ Result<Client::Page> Client::listPage(std::uint64_t containerClass, std::uint32_
 Result<std::vector<ListedContainer>> Client::list(std::uint64_t containerClass, std::uint32_t user, bool transient) {
     std::vector<ListedContainer> containers;
     for (std::optional<std::string> after = ""; after;) {
-        auto page = listPage(containerClass, user, transient, *after);
-        if (!page)
-            return std::unexpected(page.error());
-        containers.insert(containers.end(), std::make_move_iterator(page->containers.begin()),
-                          std::make_move_iterator(page->containers.end()));
-        after = std::move(page->next);
+        Page page = TRY(listPage(containerClass, user, transient, *after));
+        containers.insert(containers.end(), std::make_move_iterator(page.containers.begin()),
+                          std::make_move_iterator(page.containers.end()));
+        after = std::move(page.next);
     }
     return containers;
 }
@@ -336,24 +325,20 @@ Result<void> Client::wipePluginData(std::uint32_t user, const std::string& ident
 Result<Client::Metadata> Client::metadata(const Address& address) {
     plist::Dictionary message = addressed(ipc::Command::getMetadata, address);
     message.set(keys::infoDictRequested, true);
-    const auto reply = connection_->call(message);
-    if (!reply)
-        return std::unexpected(reply.error());
-    const std::string* path = reply->string(keys::replyPath);
+    const plist::Dictionary reply = TRY(connection_->call(message));
+    const std::string* path = reply.string(keys::replyPath);
     if (!path)
         return incomplete();
-    const plist::Dictionary* info = reply->dictionary(keys::replyInfoDictionary);
+    const plist::Dictionary* info = reply.dictionary(keys::replyInfoDictionary);
     return Metadata{
-        .path = *path, .transient = reply->isTrue(keys::replyTransient), .info = info ? converted(*info) : Map()};
+        .path = *path, .transient = reply.isTrue(keys::replyTransient), .info = info ? converted(*info) : Map()};
 }
 
 Result<Value> Client::infoValue(const Address& address, const std::string& key) {
     plist::Dictionary message = addressed(ipc::Command::getInfoValue, address);
     message.set(keys::key, key);
-    const auto reply = connection_->call(message);
-    if (!reply)
-        return std::unexpected(reply.error());
-    const plist::Value* value = reply->find(keys::replyInfoValue);
+    const plist::Dictionary reply = TRY(connection_->call(message));
+    const plist::Value* value = reply.find(keys::replyInfoValue);
     if (!value)
         return incomplete();
     return converted(*value);
@@ -387,10 +372,8 @@ Result<void> Client::setDataProtection(const ProtectionChange& change) {
 }
 
 Result<std::uint64_t> Client::diskUsage(const Address& address) {
-    const auto reply = connection_->call(addressed(ipc::Command::getDiskUsage, address));
-    if (!reply)
-        return std::unexpected(reply.error());
-    const auto bytes = reply->unsignedInteger(keys::replyDiskUsage);
+    const plist::Dictionary reply = TRY(connection_->call(addressed(ipc::Command::getDiskUsage, address)));
+    const auto bytes = reply.unsignedInteger(keys::replyDiskUsage);
     if (!bytes)
         return incomplete();
     return *bytes;
@@ -407,10 +390,8 @@ Result<std::vector<std::string>> Client::groupContainerIdentifiers(std::uint32_t
     plist::Dictionary message = request(ipc::Command::getGroupContainerIdentifiers);
     message.set(keys::userId, user);
     setIdentifier(message, identifier);
-    const auto reply = connection_->call(message);
-    if (!reply)
-        return std::unexpected(reply.error());
-    const plist::Array* array = reply->array(keys::replyGroupIdentifiersArray);
+    const plist::Dictionary reply = TRY(connection_->call(message));
+    const plist::Array* array = reply.array(keys::replyGroupIdentifiersArray);
     if (!array)
         return incomplete();
     std::vector<std::string> groups;
@@ -457,13 +438,11 @@ Result<void> Client::processEntitlements(const Registration& registration) {
 }
 
 Result<Value> status(const ConnectOptions& options) {
-    auto connection = Client::Connection::open(options, Client::Connection::Service::status);
-    if (!connection)
-        return std::unexpected(connection.error());
-    connection->startTime(connection->timeoutMilliseconds());
-    const auto reply = connection->receive();
+    auto connection = TRY(Client::Connection::open(options, Client::Connection::Service::status));
+    connection.startTime(connection.timeoutMilliseconds());
+    const auto reply = connection.receive();
     if (!reply)
-        return std::unexpected(connection->explained(reply.error()));
+        return std::unexpected(connection.explained(reply.error()));
     return Value{converted(reply->content)};
 }
 

@@ -2,6 +2,7 @@
 #include "Connection.h"
 
 #include "Diagnosis.h"
+#include "base/Try.h"
 #include "ipc/Frame.h"
 #include "ipc/Keys.h"
 #include "ipc/Names.h"
@@ -195,8 +196,7 @@ Result<std::uint64_t> Client::Connection::send(const plist::Dictionary& request)
         .payloadBytes = static_cast<std::uint32_t>(payloadBytes), .flags = ipc::frameExpectsReply, .id = ++lastId_};
     ipc::encodeFrameHeader(header, std::span(frame).first<ipc::frameHeaderBytes>());
     for (std::size_t sent = 0; sent < frame.size();) {
-        if (auto ready = waitFor(POLLOUT); !ready)
-            return std::unexpected(ready.error());
+        TRY(waitFor(POLLOUT));
         // A blocking send could wait for the rest of the frame without a limit.
         const int flags = pollWaits() ? MSG_NOSIGNAL | MSG_DONTWAIT : MSG_NOSIGNAL;
         const ssize_t count = ::send(socket_.get(), frame.data() + sent, frame.size() - sent, flags);
@@ -211,8 +211,7 @@ Result<std::uint64_t> Client::Connection::send(const plist::Dictionary& request)
 
 Result<void> Client::Connection::readAll(std::uint8_t* bytes, std::size_t count) {
     for (std::size_t have = 0; have < count;) {
-        if (auto ready = waitFor(POLLIN); !ready)
-            return ready;
+        TRY(waitFor(POLLIN));
         const ssize_t got = ::recv(socket_.get(), bytes + have, count - have, 0);
         if (got < 0 && errno == EINTR)
             continue;
@@ -225,8 +224,7 @@ Result<void> Client::Connection::readAll(std::uint8_t* bytes, std::size_t count)
 
 Result<Client::Connection::Reply> Client::Connection::receive() {
     std::array<std::uint8_t, ipc::frameHeaderBytes> headerBytes{};
-    if (auto read = readAll(headerBytes.data(), headerBytes.size()); !read)
-        return std::unexpected(read.error());
+    TRY(readAll(headerBytes.data(), headerBytes.size()));
     const ipc::FrameHeader header = ipc::decodeFrameHeader(headerBytes);
     if (!header.isValidReply() || header.payloadBytes > replyBytesMax)
         return fail(Error::Kind::protocol, "what came back is no reply");
@@ -235,8 +233,7 @@ Result<Client::Connection::Reply> Client::Connection::receive() {
     while (payload.size() < header.payloadBytes) {
         const std::size_t have = payload.size();
         payload.resize(std::min<std::size_t>(header.payloadBytes, std::max(2 * have, replyBytesFirst)));
-        if (auto read = readAll(payload.data() + have, payload.size() - have); !read)
-            return std::unexpected(read.error());
+        TRY(readAll(payload.data() + have, payload.size() - have));
     }
     auto value = plist::readBinary(payload);
     plist::Dictionary* content = value ? value->asMutableDictionary() : nullptr;
@@ -249,10 +246,8 @@ Result<plist::Dictionary> Client::Connection::replyTo(std::uint64_t id) {
     for (;;) {
         if (auto early = early_.extract(id))
             return std::move(early.mapped());
-        auto reply = receive();
-        if (!reply)
-            return std::unexpected(reply.error());
-        early_.insert_or_assign(reply->id, std::move(reply->content));
+        Reply reply = TRY(receive());
+        early_.insert_or_assign(reply.id, std::move(reply.content));
     }
 }
 
@@ -265,8 +260,7 @@ Error Client::Connection::explained(const Error& error) const {
 }
 
 Result<plist::Dictionary> Client::Connection::exchange(const plist::Dictionary& request) {
-    const auto id = send(request);
-    return id ? replyTo(*id) : std::unexpected(id.error());
+    return replyTo(TRY(send(request)));
 }
 
 Result<plist::Dictionary> Client::Connection::call(const plist::Dictionary& request) {

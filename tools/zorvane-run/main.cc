@@ -12,6 +12,7 @@
 #include "Registered.h"
 #include "Supervisor.h"
 #include "Upcall.h"
+#include "base/Try.h"
 #include "os/FileDescriptor.h"
 
 #include <algorithm>
@@ -38,35 +39,23 @@ struct Prepared {
 };
 
 Result<Prepared> prepare(const Root& root, const Options& options) {
-    const auto wanted = chooseContainers(options);
-    if (!wanted)
-        return std::unexpected(wanted.error());
-    if (hasControlCharacters(*wanted, options.identifier))
+    const WantedContainers wanted = TRY(chooseContainers(options));
+    if (hasControlCharacters(wanted, options.identifier))
         return std::unexpected(
             Failure{.what = "an identifier holds control characters", .advice = "register groups under other names"});
-    auto told = askForContainers(root, options, *wanted);
-    if (!told)
-        return std::unexpected(told.error());
-    auto mounts = openMounts(root, options, *told);
-    if (!mounts)
-        return std::unexpected(mounts.error());
-    return Prepared{.told = std::move(*told), .mounts = std::move(*mounts)};
+    ToldContainers told = TRY(askForContainers(root, options, wanted));
+    auto mounts = TRY(openMounts(root, options, told));
+    return Prepared{.told = std::move(told), .mounts = std::move(mounts)};
 }
 
 /// Looks for an assertion before anything is made, and again when all is: that may have taken minutes. Whoever waited
 /// then prepares anew, for the containers may be others by now.
 Result<int> start(const Root& root, const Options& options) {
-    if (const auto free = awaitFreedom(root, options); !free)
-        return std::unexpected(free.error());
+    (void)TRY(awaitFreedom(root, options));
     for (;;) {
-        const auto prepared = prepare(root, options);
-        if (!prepared)
-            return std::unexpected(prepared.error());
-        const auto free = awaitFreedom(root, options);
-        if (!free)
-            return std::unexpected(free.error());
-        if (*free == Freedom::found)
-            return runSandboxed(options, prepared->mounts, prepared->told);
+        const Prepared prepared = TRY(prepare(root, options));
+        if (TRY(awaitFreedom(root, options)) == Freedom::found)
+            return runSandboxed(options, prepared.mounts, prepared.told);
     }
 }
 
@@ -84,15 +73,11 @@ Result<int> run(const Options& options) {
             Failure{.what = std::move(why) + ", which would lead the program out of its sandbox",
                     .advice = "give it a file, a pipe, a terminal or /dev/null; for a socket of the network, add "
                               "--network host"});
-    const auto root = Root::open(options.root);
-    if (!root)
-        return std::unexpected(root.error());
+    const Root root = TRY(Root::open(options.root));
     if (!options.dryRun)
-        return start(*root, options);
-    const auto prepared = prepare(*root, options);
-    if (!prepared)
-        return std::unexpected(prepared.error());
-    return showPlan(options, prepared->mounts, prepared->told);
+        return start(root, options);
+    const Prepared prepared = TRY(prepare(root, options));
+    return showPlan(options, prepared.mounts, prepared.told);
 }
 
 /// A command line that cannot be parsed may still say how that is to be told.

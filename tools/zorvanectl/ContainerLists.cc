@@ -3,6 +3,7 @@
 
 #include "KnownContainer.h"
 #include "Users.h"
+#include "base/Try.h"
 
 #include <algorithm>
 #include <tuple>
@@ -20,10 +21,8 @@ bool isOver(const Error& error) {
 
 zorvane::Result<void> addClass(Client& client, std::uint64_t containerClass, std::uint32_t user, const Target& target,
                                std::vector<FoundContainer>& found) {
-    const auto listed = client.list(containerClass, user, target.transient);
-    if (!listed)
-        return std::unexpected(listed.error());
-    for (const zorvane::ListedContainer& container : *listed)
+    const auto listed = TRY(client.list(containerClass, user, target.transient));
+    for (const zorvane::ListedContainer& container : listed)
         if (target.identifier.empty() || container.identifier == target.identifier)
             found.push_back({.address = {.containerClass = containerClass,
                                          .user = user,
@@ -85,25 +84,17 @@ void sort(std::vector<FoundContainer>& containers, const std::string& order) {
 
 zorvane::Result<FoundContainers> findContainers(Client& client, const std::string& root, const Target& target,
                                                 const Listing& listing) {
-    zorvane::Result<FoundContainers> found;
+    FoundContainers found;
     if (listing.all)
-        found = findAll(client, root, target);
-    else if (const auto added =
-                 addClass(client, target.containerClass, userOf(target), target, found.emplace().containers);
-             !added)
-        return std::unexpected(added.error());
-    if (!found)
-        return found;
+        found = TRY(findAll(client, root, target));
+    else
+        TRY(addClass(client, target.containerClass, userOf(target), target, found.containers));
     std::vector<FoundContainer> whole;
-    for (FoundContainer& container : found->containers) {
-        const auto stays = addDetails(client, listing, container);
-        if (!stays)
-            return std::unexpected(stays.error());
-        if (*stays)
+    for (FoundContainer& container : found.containers)
+        if (TRY(addDetails(client, listing, container)))
             whole.push_back(std::move(container));
-    }
-    found->containers = std::move(whole);
-    sort(found->containers, listing.order);
+    found.containers = std::move(whole);
+    sort(found.containers, listing.order);
     return found;
 }
 

@@ -2,6 +2,7 @@
 #include "KnownContainer.h"
 
 #include "base/ContainerClass.h"
+#include "base/Try.h"
 
 #include <algorithm>
 
@@ -12,11 +13,9 @@ std::uint32_t userOf(const Target& target) {
 }
 
 zorvane::Result<zorvane::Client::Address> find(zorvane::Client& client, const Target& target, bool transient) {
-    const auto containers = client.list(target.containerClass, userOf(target), transient);
-    if (!containers)
-        return std::unexpected(containers.error());
-    const auto found = std::ranges::find(*containers, target.identifier, &zorvane::ListedContainer::identifier);
-    if (found == containers->end())
+    const auto containers = TRY(client.list(target.containerClass, userOf(target), transient));
+    const auto found = std::ranges::find(containers, target.identifier, &zorvane::ListedContainer::identifier);
+    if (found == containers.end())
         return std::unexpected(zorvane::Error{.kind = zorvane::Error::Kind::daemon,
                                               .code = codeNotFound,
                                               .message = std::string("there is no ") +

@@ -1,6 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "RegisteredEntitlements.h"
 
+#include "base/Try.h"
+
 #include <algorithm>
 
 namespace zorvanectl {
@@ -26,14 +28,12 @@ std::vector<std::string> strings(const zorvane::List* list) {
 } // namespace
 
 zorvane::Result<RegisteredEntitlements> RegisteredEntitlements::ask(const zorvane::ConnectOptions& connect) {
-    auto status = zorvane::status(connect);
-    if (!status)
-        return std::unexpected(status.error());
+    zorvane::Value status = TRY(zorvane::status(connect));
     const auto failed = [](std::string message) {
         return std::unexpected(
             zorvane::Error{.kind = zorvane::Error::Kind::refused, .code = 0, .message = std::move(message)});
     };
-    auto* map = std::get_if<zorvane::Map>(&status->content);
+    auto* map = std::get_if<zorvane::Map>(&status.content);
     if (map && in<bool>(map, statusEntitlementsLeftOut))
         return failed("the registered entitlements are too many or nest too deep for the status socket, or the daemon "
                       "has too little memory");

@@ -5,6 +5,7 @@
 #include "ItemRules.h"
 #include "SealedDirectory.h"
 #include "Unpacker.h"
+#include "base/Try.h"
 #include "fs/DiskUsage.h"
 #include "fs/RecursiveCopy.h"
 #include "zorvane/Text.h"
@@ -40,13 +41,9 @@ Outcome<void> checkTarEnd(int archive, std::uint64_t bytes) {
 Outcome<void> unpack(zor::platform::Disk& disk, const SealedDirectory& sealed, const Source& source, Owner owner,
                      Course& course) {
     course.expectBytes(source.bytes());
-    const auto decoder = Decoder::start(source.get());
-    if (!decoder)
-        return std::unexpected(decoder.error());
-    const auto end = Unpacker(disk, sealed.get(), owner, course).unpack(decoder->records());
-    if (!end)
-        return std::unexpected(end.error());
-    return (*end & recordUncompressedTar) != 0 ? checkTarEnd(source.get(), source.bytes()) : Outcome<void>();
+    const Decoder decoder = TRY(Decoder::start(source.get()));
+    const std::uint32_t end = TRY(Unpacker(disk, sealed.get(), owner, course).unpack(decoder.records()));
+    return (end & recordUncompressedTar) != 0 ? checkTarEnd(source.get(), source.bytes()) : Outcome<void>();
 }
 
 /// Copies a directory, and keeps why an item was refused.
@@ -111,10 +108,7 @@ private:
 
 Outcome<Source> Source::open(const std::string& path) {
     Source source;
-    auto file = openForInstallation(path, source.holders_);
-    if (!file)
-        return std::unexpected(file.error());
-    source.file_ = std::move(*file);
+    source.file_ = TRY(openForInstallation(path, source.holders_));
     struct stat status{};
     if (::fstat(source.file_.get(), &status) != 0)
         return failed(zorvane::printable(path) + " cannot be opened", errno);
@@ -171,29 +165,25 @@ Outcome<Progress> putContent(zor::platform::Disk& disk, int container, const Sou
             observer.progressed(phase, progress);
     };
     Course course(container, stop, [&](const Progress& progress) { report(Phase::copying, progress); });
-    if (auto room = course.checkRoom(); !room)
-        return std::unexpected(room.error());
-    auto sealed = SealedDirectory::make(disk, container);
-    if (!sealed)
-        return std::unexpected(sealed.error());
+    TRY(course.checkRoom());
+    SealedDirectory sealed = TRY(SealedDirectory::make(disk, container));
     Outcome<void> done;
     if (source.isDirectory()) {
         if (observer.wantsShare)
             course.expectBytes(zor::fs::diskUsage(source.get(), {}, {}).bytes);
-        done = DirectoryCopy(status, source, course).copy(disk, source, *sealed);
+        done = DirectoryCopy(status, source, course).copy(disk, source, sealed);
     } else {
-        done = unpack(disk, *sealed, source, {.user = status.st_uid, .group = status.st_gid}, course);
+        done = unpack(disk, sealed, source, {.user = status.st_uid, .group = status.st_gid}, course);
     }
     if (done)
-        done = sealed->raise();
+        done = sealed.raise();
     report(Phase::syncing, course.progress());
     if (done)
         if (const int synced = disk.syncFileSystem(container); synced < 0)
             done = failed("the content cannot be brought to the disk", -synced);
     if (done)
         done = course.checkStopped();
-    if (!done)
-        return std::unexpected(done.error());
+    TRY(std::move(done));
     return course.progress();
 }
 

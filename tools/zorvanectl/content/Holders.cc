@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Holders.h"
 
+#include "base/Try.h"
 #include "zorvane/Text.h"
 
 #include <algorithm>
@@ -38,8 +39,7 @@ public:
         if (path_.empty())
             return cannotOpen(ENOENT);
         rest_ = path_;
-        if (auto begun = begin(); !begun)
-            return std::unexpected(begun.error());
+        TRY(begin());
         for (;;) {
             std::string name = takeName();
             if (name.empty()) // a path that ends with a slash, or a link to "/"
@@ -48,14 +48,12 @@ public:
             struct stat status{};
             if (!place.valid() || ::fstat(place.get(), &status) != 0)
                 return cannotOpen(errno);
-            if (S_ISLNK(status.st_mode)) {
-                if (auto followed = follow(name, place, status); !followed)
-                    return std::unexpected(followed.error());
-            } else if (rest_.empty()) {
+            if (S_ISLNK(status.st_mode))
+                TRY(follow(name, place, status));
+            else if (rest_.empty())
                 return openLast(name);
-            } else if (auto entered = enter(name); !entered) {
-                return std::unexpected(entered.error());
-            }
+            else
+                TRY(enter(name));
         }
     }
 
