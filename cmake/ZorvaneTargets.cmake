@@ -3,7 +3,6 @@
 set(CMAKE_CXX_STANDARD 23)
 set(CMAKE_CXX_STANDARD_REQUIRED ON)
 set(CMAKE_CXX_EXTENSIONS OFF)
-option(CMAKE_EXPORT_COMPILE_COMMANDS "What editors and clang tools read" ON)
 set(CMAKE_RUNTIME_OUTPUT_DIRECTORY ${CMAKE_BINARY_DIR}/bin)
 
 add_library(zor_options INTERFACE)
@@ -27,8 +26,8 @@ target_include_directories(zor_options INTERFACE ${CMAKE_SOURCE_DIR}/src)
 set(CMAKE_POSITION_INDEPENDENT_CODE OFF)
 target_compile_options(zor_options INTERFACE -fPIC)
 
-# Half of a translation unit's time went into the headers of libraries. What is installed still includes what it uses: clang-tidy
-# looks at it without.
+# Half of a translation unit's time went into the headers of libraries. tools/house.py looks whether sources include what they
+# use of those.
 # zor_precompile(name LINK ... HEADERS ...): the standard headers and these, for the targets of this folder from here on.
 option(ZORVANE_PCH "Precompile the headers of libraries" ON)
 macro(zor_precompile name)
@@ -48,9 +47,7 @@ function(zor_use_pch target)
         target_precompile_headers(${target} REUSE_FROM ${ZORVANE_PRECOMPILED})
     endif()
 endfunction()
-if(NOT ZORVANE_TIDY)
-    zor_precompile(zor_pch)
-endif()
+zor_precompile(zor_pch)
 
 # zor_library(name DIR folders... [EXCLUDE files...] LINK ... [INCLUDE folders...]): the sources of these folders, as zor_<name>.
 function(zor_library name)
@@ -103,10 +100,13 @@ function(zor_program name)
         $<$<BOOL:${ZORVANE_STATIC_RUNTIME}>:-static-libstdc++;-static-libgcc>)
 endfunction()
 
-# zor_test(area [DIR dirs...] LINK libs...): every tests/<area>/*.cc, or those of the folders, in one GoogleTest program
-# named zor_<area>_tests.
+# zor_test(area [DIR dirs...] [COST seconds] LINK libs...): every tests/<area>/*.cc, or those of the folders, in one GoogleTest
+# program named zor_<area>_tests. Tests that cost more begin earlier.
 function(zor_test area)
-    cmake_parse_arguments(ARG "" "" "DIR;LINK" ${ARGN})
+    cmake_parse_arguments(ARG "" "COST" "DIR;LINK" ${ARGN})
+    if(NOT ARG_COST)
+        set(ARG_COST 0)
+    endif()
     if(NOT ARG_DIR)
         set(ARG_DIR ${area})
     endif()
@@ -125,7 +125,7 @@ function(zor_test area)
     target_compile_definitions(zor_${area}_tests PRIVATE ZORVANE_SOURCE_DIR="${CMAKE_SOURCE_DIR}"
         ZORVANE_BINARY_DIR="${CMAKE_BINARY_DIR}")
     target_link_libraries(zor_${area}_tests PRIVATE zor_options ${ARG_LINK} GTest::gtest GTest::gtest_main)
-    gtest_discover_tests(zor_${area}_tests DISCOVERY_MODE PRE_TEST NO_PRETTY_VALUES PROPERTIES TIMEOUT 300)
+    gtest_discover_tests(zor_${area}_tests DISCOVERY_MODE PRE_TEST NO_PRETTY_VALUES PROPERTIES TIMEOUT 300 COST ${ARG_COST})
 endfunction()
 
 # zor_fuzz(name LINK libs...): fuzz/<name>.cc as a libFuzzer program. Its seeds are the files in fuzz/seeds/<name>/.

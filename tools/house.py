@@ -3,8 +3,9 @@
 """The rules of the house that no compiler knows, as a part of ./dev lint.
 
 Calls that pass by the layer that owns them, includes that go up (the table is docs/architecture.md's), circles of headers,
-sources without a head, checks that were silenced, and a page of threats that names tests which do not exist. Prints one line
-for each fault and ends with 1. Before it judges the tree it breaks each rule once and ends with 2 where that stays unseen.
+standard headers that are used and not included, sources without a head, checks that were silenced, and a page of threats that
+names tests which do not exist. Prints one line for each fault and ends with 1. Before it judges the tree it breaks each rule
+once and ends with 2 where that stays unseen.
 """
 import re
 import sys
@@ -15,7 +16,7 @@ SYSTEM = ("src/os/", "src/service/", "src/identity/", "src/device/")
 KERNEL = ("src/fs/", *SYSTEM, "client/", "tools/")  # tools run with their user's rights, on their user's paths
 DISK = (*SYSTEM, "client/", "tools/")
 PATHS = "a descriptor and src/fs: a path can be swapped between two calls"
-MUTEX = "base/Mutex.h: the lint build checks its locks"
+MUTEX = "base/Mutex.h: ./dev lint checks its locks"
 # Words of the programs' code, folders or files in which they may stand, what to use instead. "::f(" is the global function.
 CALLS = [
     ("std::filesystem <filesystem> std::ifstream std::ofstream std::fstream", (), PATHS),
@@ -42,6 +43,18 @@ CALLS = [
 TEXTS = [(r"#if [0]", "removing the code: history keeps it"), (r"\b(FIX[M]E|TO[D]O)\b", "doing it"),
          (r"\bDISABLED[_]", "a test that runs, or none"), (r"specif[i]cation", "this system's own words"),
          (r"Part [0-9]\.[0-9]", "this system's own words"), (r"NO[L]INT(NEXTLINE|BEGIN|END)?(?![\w(])", "the check's name")]
+# Standard headers that the builds precompile (cmake/ZorvaneTargets.cmake), so that no compiler misses them, and names of theirs.
+STANDARD = {
+    "algorithm": r"(ranges::)?(all_of|any_of|binary_search|clamp|contains|copy|count|count_if|equal|fill|find|find_if|for_each|"
+                 r"lower_bound|max|max_element|min|min_element|mismatch|none_of|remove_if|reverse|search|sort|stable_sort|"
+                 r"transform|unique|upper_bound)",
+    "atomic": r"atomic\w*", "condition_variable": "condition_variable", "deque": "deque", "expected": "(un)?expected",
+    "functional": "(bind_front|c?ref|function|greater|hash|invoke|less)", "map": "(multi)?map",
+    "memory": r"(enable_shared_from_this|make_shared|make_unique\w*|shared_ptr|unique_ptr|weak_ptr)",
+    "mutex": "(call_once|lock_guard|mutex|once_flag|unique_lock)", "optional": "(nullopt|optional)", "set": "(multi)?set",
+    "span": "span", "string": "(string|to_string)", "string_view": "string_view", "thread": "(this_thread|thread)",
+    "unordered_set": "unordered_set", "variant": "(get_if|holds_alternative|monostate|variant|visit)", "vector": "vector"}
+STANDARD = {header: re.compile(rf"(?<![\w:])std::{names}(?!\w)") for header, names in STANDARD.items()}
 TOKEN = re.compile(r'R"([^(\s]*)\((?:.|\n)*?\)\1"|//[^\n]*|/\*(?:.|\n)*?\*/|"(?:\\.|[^"\\\n])*"|(?<!\w)\'(?:\\.|[^\'\\\n])*\'')
 
 
@@ -135,6 +148,20 @@ def include_faults(rules, files):
     return faults + [f"{path}: is on a circle of includes" for path in sorted(left)]
 
 
+def standard_faults(files):
+    own = {path: [target for _, target in includes_of(files, path) if target] for path in files}
+    faults = []
+    for path, text in files.items():
+        reached = [path]  # and what it includes of ours, and so on
+        for one in reached:
+            reached += [target for target in own[one] if target not in reached]
+        headers = {header for one in reached for header in re.findall(r"(?m)^#include <([^>]*)>", files[one])}
+        code = code_of(text)
+        faults += [f"{path}: uses {used[0]} and does not include <{header}>" for header, names in STANDARD.items()
+                   if header not in headers and (used := names.search(code))]
+    return faults
+
+
 def page_faults(page, tests):
     rows = [line for line in page.splitlines() if line.startswith("| **")]
     faults = [f"docs/security.md: no test: {row[:60]}" for row in rows if not re.search(r"`\w+\.\w+`", row)]
@@ -162,6 +189,8 @@ def blind_rules():
         "heads": [len(head_faults("src/A.h", text, False)) for text in
                   (head + "#pragma once\n", head, "#pragma once\n", head + "#pragma once\n" * 600)] == [0, 1, 2, 1],
         "includes": len(include_faults(rules, pairs)) == 4,
+        "standard headers": len(standard_faults({"src/low/A.cc": '#include "low/A.h"\nstd::map<int, std::string> a;\n',
+                                                "src/low/A.h": "#include <map>\n", "src/top/B.h": "Astd::map a; // std::map\n"})) == 1,
         "tests of the page": len(page_faults("| **A** | b | `No.Test` |\n| **A** | b | c |\n", {"A.B"})) == 2,
     }
     return blind + [name for name, holds in checks.items() if not holds]
@@ -180,6 +209,10 @@ def main():
     faults = include_faults(rules, programs) + page_faults((ROOT / "docs/security.md").read_text(), tests)
     faults += [f"docs/architecture.md: there is no {name}" for folder, allowed in rules.items()
                for name in {folder} | allowed if not (ROOT / name).exists()]
+    faults += standard_faults(programs)
+    targets = (ROOT / "cmake/ZorvaneTargets.cmake").read_text().partition("target_precompile_headers(")[2]
+    if set(re.findall(r"<(\w+)>", targets.partition(")")[0])) != set(STANDARD):
+        faults.append("tools/house.py: STANDARD has other headers than cmake/ZorvaneTargets.cmake precompiles")
     for path, text in programs.items():
         faults += call_faults(path, text)
     for path, text in sources.items():

@@ -8,6 +8,7 @@
 #include "fs/TreeWalker.h"
 #include "os/Openat2.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <climits>
 #include <deque>

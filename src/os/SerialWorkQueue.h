@@ -11,6 +11,7 @@
 #include "platform/WorkQueue.h"
 
 #include <deque>
+#include <string>
 #include <thread>
 
 namespace zor::platform {

@@ -6,6 +6,7 @@
 
 #include "fs/TreeWorld.h"
 
+#include <algorithm>
 #include <linux/posix_acl.h>
 #include <linux/posix_acl_xattr.h>
 #include <sys/xattr.h>

@@ -42,10 +42,11 @@ public:
         const platform::MutexLock held(mutex_);
         lines_.push_back({level, std::string(function), std::string(message)});
         if (const auto* request = LogSubject::current().request) {
-            request_.clear();
+            std::string told;
             (*request)([&](std::string_view name, std::string_view value) {
-                request_.append(name).append("=").append(value).append(" ");
+                told.append(name).append("=").append(value).append(" ");
             });
+            request_ = std::move(told);
         }
     }
     void writeToSystemLog(int priority, std::string_view message) override { write(priority, "syslog", message); }
