@@ -46,20 +46,19 @@ Failure notFound(const std::string& cannot, const std::string& path, const std::
     return {.what = cannot, .advice = advice};
 }
 
-zor::ErrnoOr<FileDescriptor> openPlain(const Root& root, const std::string& path) {
-    const std::string relative = path.substr(root.path == "/" ? 1 : root.path.size() + 1);
-    return openBeneath(root.descriptor.get(), relative.c_str(), O_PATH | O_DIRECTORY);
+/// Of an absolute path below the root, where the relative one begins.
+std::size_t beginBelow(const Root& root) {
+    return root.path == "/" ? 1 : root.path.size() + 1;
 }
 
-/// A container below the home, if there is one. Whoever owns a directory there can mount a file system that never
-/// answers: none is entered.
-zor::ErrnoOr<FileDescriptor> openContainer(const Root& root, const std::string& path, const std::string& home) {
-    using zor::fs::MountFence;
-    const std::size_t begin = root.path == "/" ? 1 : root.path.size() + 1;
-    auto opened = home.empty()
-                      ? openPlain(root, path)
-                      : MountFence(root.descriptor.get(), std::string_view(home).substr(begin), MountFence::Kind::home)
-                            .open(path.c_str() + begin, O_PATH | O_DIRECTORY);
+zor::ErrnoOr<FileDescriptor> openPlain(const Root& root, const std::string& path) {
+    return openBeneath(root.descriptor.get(), path.substr(beginBelow(root)).c_str(), O_PATH | O_DIRECTORY);
+}
+
+/// A container below the home's fence, if there is one. Whoever owns a directory there can mount a file system that
+/// never answers: none is entered.
+zor::ErrnoOr<FileDescriptor> openContainer(const Root& root, const std::string& path, zor::fs::MountFence* home) {
+    auto opened = home ? home->open(path.c_str() + beginBelow(root), O_PATH | O_DIRECTORY) : openPlain(root, path);
     // A program would find nothing of its own there, and make it anew.
     if (opened && zor::platform::hidesNames(opened->get()))
         return zor::Errno(ENOKEY);
@@ -79,8 +78,10 @@ std::string cannotOpen(const std::string& place, zor::Errno error) {
 class Collector {
 public:
     Collector(const Root& root, const Options& options, const std::string& home, std::vector<Mount>& mounts)
-        : root_(root), options_(options), home_(home), systemUser_(zorvane::containerOwners(root.path).system),
-          mounts_(mounts) {}
+        : root_(root), options_(options),
+          home_(root.descriptor.get(), std::string_view(home).substr(std::min(home.size(), beginBelow(root))),
+                zor::fs::MountFence::Kind::home),
+          systemUser_(zorvane::containerOwners(root.path).system), mounts_(mounts) {}
 
     Result<void> container(Mount::Kind kind, const std::string& identifier, const std::string& path) {
         const std::string what = "the " + std::string(kindName(kind)) + " container of " + identifier;
@@ -92,7 +93,7 @@ public:
             "somebody has changed the directory: look who can write to the one that holds it, and put the container "
             "back where it was";
         const bool users = kind == Mount::Kind::data || kind == Mount::Kind::applicationGroup;
-        auto directory = openContainer(root_, path, users ? home_ : std::string());
+        auto directory = openContainer(root_, path, users && !home_.path().empty() ? &home_ : nullptr);
         if (!directory && directory.error() == ENOENT)
             return std::unexpected(notFound(cannotOpen(what + " " + path, directory.error()), path, advice));
         if (!directory)
@@ -170,7 +171,8 @@ public:
 private:
     const Root& root_;
     const Options& options_;
-    const std::string& home_;
+    /// One for all containers: it asks the home once whether it answers.
+    zor::fs::MountFence home_;
     const uid_t systemUser_;
     std::vector<Mount>& mounts_;
 };

@@ -66,10 +66,15 @@ Result<FileDescriptor> connectTo(const Root& root) {
 Result<std::vector<std::uint8_t>> exchange(int socket, const std::vector<std::uint8_t>& request) {
     if (::send(socket, request.data(), request.size(), MSG_NOSIGNAL) != static_cast<ssize_t>(request.size()))
         return failed(withReason("cannot send to zorvaned", zor::Errno::last()), seeLog);
-    std::vector<std::uint8_t> reply(replyBytesMax);
+    std::vector<std::uint8_t> reply;
     ssize_t bytes = 0;
     do {
-        bytes = ::recv(socket, reply.data(), reply.size(), MSG_TRUNC);
+        // How long the packet is, and then the packet: room for the longest would be a megabyte to be cleared.
+        bytes = ::recv(socket, nullptr, 0, MSG_PEEK | MSG_TRUNC);
+        if (bytes > 0 && static_cast<std::size_t>(bytes) <= replyBytesMax) {
+            reply.resize(static_cast<std::size_t>(bytes));
+            bytes = ::recv(socket, reply.data(), reply.size(), MSG_TRUNC);
+        }
     } while (bytes < 0 && errno == EINTR);
     if (bytes < 0)
         return failed(withReason("zorvaned does not answer the upcall", zor::Errno::last()), seeLog);
@@ -77,7 +82,6 @@ Result<std::vector<std::uint8_t>> exchange(int socket, const std::vector<std::ui
         return failed("zorvaned ended the upcall's connection", seeLog);
     if (static_cast<std::size_t>(bytes) > reply.size())
         return failed("zorvaned's answer is too large", seeLog);
-    reply.resize(static_cast<std::size_t>(bytes));
     return reply;
 }
 

@@ -19,6 +19,7 @@
 #include <csignal>
 #include <cstdio>
 #include <cstring>
+#include <malloc.h>
 #include <unistd.h>
 
 namespace {
@@ -98,6 +99,7 @@ int main(int argumentCount, char** arguments) {
     if (argumentCount > 1 && std::strcmp(arguments[1], insideOption) == 0)
         ::_exit(runInside(argumentCount, arguments)); // there is nothing to be tidied up in the sandbox
     std::signal(SIGXFSZ, SIG_IGN);                    // a file that may not grow is an error to be told, not an end
+    ::mallopt(M_ARENA_MAX, 1);                        // the threads that ask file systems are few and short
     const auto options = parseOptions(argumentCount, arguments);
     if (!options)
         return sayEnd(options.error(), argumentCount, arguments);
