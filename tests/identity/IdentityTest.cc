@@ -219,6 +219,23 @@ TEST(IdentityRegistry, FollowsChanges) {
     world.registry.unfollow(loop);
 }
 
+// Goal: a program that came with the directory above its own, of which no notice tells, is known at once. Method: that
+// directory is exchanged, less than a second after the registry has looked.
+TEST(IdentityRegistry, KnowsAProgramThatCameWithADirectory) {
+    PeerWorld world;
+    for (const std::string above : {"above", "next"}) {
+        std::filesystem::create_directories(world.test.path(above + "/bin"));
+        world.copyProgram("/bin/sh", above + "/bin/agent");
+    }
+    world.registerAs("a.plist", "above/bin/agent", "agent");
+    world.registry.takeNotices();
+    std::filesystem::rename(world.test.path("above"), world.test.path("old"));
+    std::filesystem::rename(world.test.path("next"), world.test.path("above"));
+    ::usleep(30'000); // a look that was a moment ago is not repeated
+    const PeerProcess process(world.server, world.program("above/bin/agent"));
+    EXPECT_EQ(who(*world.peerOf(process)), "agent");
+}
+
 // Goal: a file that is being copied into the registry is not called wrong before it is whole, nor a wrong one right.
 // Method: one written in two halves, with a look after each; then one that stays half.
 TEST(IdentityRegistry, SaysNothingOfAFileThatIsBeingWritten) {
