@@ -129,7 +129,8 @@ ErrnoOr<PasswordEntry> LinuxPasswordDatabase::findInFile(const Matches& matches)
             read->entries.push_back(std::move(entry));
             return keeps;
         });
-        if (keeps && settled && end == ENOENT && stampOf(descriptor) == stamp) {
+        const auto after = stampOf(descriptor);
+        if (keeps && settled && end == ENOENT && after && *after == stamp) {
             const MutexLock held(mutex_);
             content_ = read;
         }
