@@ -1,9 +1,13 @@
 # SPDX-License-Identifier: Apache-2.0
 """Every request of the Python module, and asyncio, with the daemon of a root: a function that is declared in another form than the
-library has it does not come back with what went in. usage: commands.py ROOT"""
+library has it does not come back with what went in. Then the interpreter, which is to be a copy, is replaced as an upgrade does
+while a client is connected. usage: commands.py ROOT"""
 import asyncio
 import datetime
+import os
+import shutil
 import sys
+import time
 
 import zorvane
 from zorvane import requests
@@ -15,11 +19,11 @@ entitlements = {"com.veltra.security.application-groups": ["group.a"], "com.velt
                 "com.veltra.security.system-container": True}
 
 
-def expect(error, call, code=0):
+def expect(error, call, code=0, says=""):
     try:
         call()
     except error as caught:
-        assert caught.code == code and str(caught), caught
+        assert caught.code == code and str(caught) and says in str(caught), caught
         return
     raise AssertionError(f"no {error}")
 
@@ -58,3 +62,11 @@ async def beside():
         assert [one.identifier for one in found] == [f"org.{number}" for number in range(20)]
 
 asyncio.run(beside())
+
+with zorvane.Client(root, timeout=20) as client:
+    assert client.find(2, "org.1", 501)
+    shutil.copy(sys.executable, sys.executable + ".new")
+    os.rename(sys.executable + ".new", sys.executable)
+    # The daemon takes notice within a second.
+    expect(zorvane.Refused, lambda: [(client.find(2, "org.1", 501), time.sleep(0.05)) for _ in range(100)],
+           says="its executable was replaced while it ran")

@@ -1,9 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // zorvanectl install against a real daemon: what comes in, and what stays when it does not.
 #include "archives/ArchiveMaker.h"
-#include "ipc/Keys.h"
 #include "process/DaemonProcess.h"
-#include "support/FakeServer.h"
+#include "process/Relay.h"
 #include "whole/Expect.h"
 
 #include <atomic>
@@ -45,39 +44,6 @@ void install(const DaemonProcess& daemon, const std::string& source) {
     const auto done = runProgram(installing(daemon.root(), source));
     ASSERT_EQ(done.exitStatus, 0) << done.output;
 }
-
-/// The fate of a request: it reaches the daemon; nothing comes for ten seconds, or until the client goes, and then
-/// the connection ends; it ends at once.
-enum class Fate { passedOn, unanswered, hungUp };
-
-/// A root with a socket that passes requests on to a real daemon, or loses them where the test wants that: what a
-/// client meets whose daemon is slow, or is being started anew. `judge` is called by a thread for each connection.
-class Relay : public support::FakeServer {
-public:
-    Relay(const DaemonProcess& daemon, std::function<Fate(ipc::Command)> judge)
-        : FakeServer([path = daemon.path("run/zorvane/com.veltra.zorvaned"), judge = std::move(judge)](int from) {
-              const platform::FileDescriptor to(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-              EXPECT_TRUE(support::connectTo(to.get(), path));
-              while (const auto request = support::receiveFrame(from)) {
-                  const auto command = request->message().unsignedInteger(ipc::keys::command).value_or(0);
-                  const Fate fate = judge(static_cast<ipc::Command>(command));
-                  if (fate == Fate::unanswered) {
-                      support::limitWaiting(from);
-                      (void)support::receiveFrame(from);
-                  }
-                  if (fate != Fate::passedOn)
-                      return;
-                  support::sendAll(to.get(), frameOf(*request));
-                  if (const auto reply = support::receiveFrame(to.get()))
-                      support::sendAll(from, frameOf(*reply));
-              }
-          }) {}
-
-private:
-    static plist::Data frameOf(const support::Frame& frame) {
-        return support::frameOf(frame.header.payloadBytes, frame.header.flags, frame.header.id, frame.payload);
-    }
-};
 
 /// An installer whose system calls are looked at.
 class TracedInstaller {
