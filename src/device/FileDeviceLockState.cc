@@ -2,6 +2,7 @@
 #include "device/FileDeviceLockState.h"
 
 #include "base/Try.h"
+#include "os/CoarseClock.h"
 #include "os/Inotify.h"
 #include "os/Names.h"
 #include "os/Openat2.h"
@@ -11,6 +12,7 @@
 #include <charconv>
 #include <chrono>
 #include <fcntl.h>
+#include <poll.h>
 #include <sys/inotify.h>
 #include <unistd.h>
 #include <utility>
@@ -27,7 +29,11 @@ constexpr std::chrono::milliseconds lookEvery{250};
 /// A file that was changed twice within one tick of the kernel's clock looks the same after both; one that was left
 /// alone for as long as this will not.
 constexpr time_t settledSeconds = 1;
-constexpr std::uint32_t watchedEvents = IN_MOVED_TO | IN_MOVED_FROM | IN_CREATE | IN_DELETE | IN_CLOSE_WRITE;
+constexpr std::uint32_t toldEvents = IN_MOVED_TO | IN_MOVED_FROM | IN_CREATE | IN_DELETE | IN_CLOSE_WRITE;
+/// These alone are half a change, which the loop is not told of; what was read before does not count any more.
+constexpr std::uint32_t watchedEvents = toldEvents | IN_MODIFY | IN_ATTRIB;
+/// A change that gives no notice (through memory, or another host's on a shared file system) is seen by then.
+constexpr std::int64_t keptMilliseconds = 1000;
 
 int parseState(std::string_view text) {
     if (text.ends_with('\n'))
@@ -45,9 +51,38 @@ bool FileDeviceLockState::Known::isOf(const struct stat& status) const {
 }
 
 int FileDeviceLockState::currentState() const {
+    if (const auto state = keptState())
+        return *state;
+    // A notice that comes after this is of a change that the look may have missed.
+    const std::uint64_t takes = takes_;
+    const auto state = look();
+    if (!state && state.error() != ENOENT)
+        return stateUnread(state.error());
+    const MutexLock held(mutex_);
+    kept_ = {.state = state.value_or(unlocked),
+             .takes = takes,
+             .untilMilliseconds = coarseMilliseconds() + keptMilliseconds};
+    return kept_->state;
+}
+
+std::optional<int> FileDeviceLockState::keptState() const {
+    // The order counts. The loop says that it takes notices before it does and when it has: where it took one away
+    // between the look that is kept and this question to the queue, the number that is read afterwards is another one,
+    // or odd.
+    pollfd notices{.fd = notices_, .events = POLLIN, .revents = 0};
+    if (notices.fd < 0 || ::poll(&notices, 1, 0) != 0)
+        return std::nullopt;
+    const std::uint64_t takes = takes_;
+    const MutexLock held(mutex_);
+    if (!kept_ || takes % 2 != 0 || kept_->takes != takes || coarseMilliseconds() >= kept_->untilMilliseconds)
+        return std::nullopt;
+    return kept_->state;
+}
+
+ErrnoOr<int> FileDeviceLockState::look() const {
     struct stat status{};
     if (::fstatat(root_.runtimeDirectory(), names::lockState, &status, AT_SYMLINK_NOFOLLOW) != 0)
-        return stateUnread(Errno::last());
+        return Errno::last();
     {
         const MutexLock held(mutex_);
         if (known_ && known_->isOf(status))
@@ -56,16 +91,16 @@ int FileDeviceLockState::currentState() const {
     return readState();
 }
 
-int FileDeviceLockState::readState() const {
+ErrnoOr<int> FileDeviceLockState::readState() const {
     const auto file = openBeneath(root_.runtimeDirectory(), names::lockState, O_RDONLY | O_NONBLOCK);
     if (!file)
-        return stateUnread(file.error());
+        return file.error();
     struct stat status{};
     timespec now{};
     const bool examined = ::fstat(file->get(), &status) == 0 && ::clock_gettime(CLOCK_REALTIME, &now) == 0;
     const auto text = readSmallFile(file->get(), stateBytesMax);
     if (!text)
-        return stateUnread(text.error());
+        return text.error();
     const int state = parseState(*text);
     const MutexLock held(mutex_);
     known_.reset();
@@ -79,8 +114,6 @@ int FileDeviceLockState::readState() const {
 }
 
 int FileDeviceLockState::stateUnread(Errno error) const {
-    if (error == ENOENT)
-        return unlocked;
     if (isOwnShortage(error) && again_)
         again_->set(again);
     return unknown;
@@ -112,6 +145,8 @@ Errno FileDeviceLockState::follow() {
     if (!watched)
         return Errno(ENOMEM);
     inotify_ = std::move(inotify);
+    takes_ += 2; // what was kept before had no notices
+    notices_ = inotify_.get();
     return Errno();
 }
 
@@ -122,10 +157,13 @@ void FileDeviceLockState::lookAgain() {
     changed_();
 }
 
-bool FileDeviceLockState::takeEvents() const {
-    return readInotify(inotify_.get(), [](const inotify_event& event, std::string_view name) {
-        return (event.mask & IN_Q_OVERFLOW) != 0 || name == names::lockState;
+bool FileDeviceLockState::takeEvents() {
+    ++takes_;
+    const bool told = readInotify(inotify_.get(), [](const inotify_event& event, std::string_view name) {
+        return (event.mask & IN_Q_OVERFLOW) != 0 || ((event.mask & toldEvents) != 0 && name == names::lockState);
     });
+    ++takes_;
+    return told;
 }
 
 } // namespace zor::platform
