@@ -5,16 +5,16 @@
 #include "base/ZORError.h"
 #include "fs/BulkDirectoryRead.h"
 #include "fs/ItemStatus.h"
+#include "fs/SharedWork.h"
 #include "fs/TreeWalker.h"
 #include "os/Openat2.h"
 
 #include <algorithm>
 #include <cerrno>
-#include <climits>
-#include <deque>
 #include <dirent.h>
 #include <fcntl.h>
 #include <linux/magic.h>
+#include <memory>
 #include <optional>
 #include <sys/stat.h>
 #include <sys/vfs.h>
@@ -26,9 +26,8 @@ using platform::FileDescriptor;
 
 namespace {
 
-// The directories that may wait at once; beyond that a directory is measured when it is met.
-constexpr std::size_t queuedDirectoriesMax = 65'536;
-constexpr std::size_t queuedBytesMax = 16 * 1024 * 1024;
+/// A second thread costs more than it brings for a tree of fewer entries.
+constexpr std::uint64_t entriesForTwoThreads = 512;
 constexpr std::uint64_t blockBytes = 512;
 constexpr std::uint32_t xfsMagic = 0x58465342;
 
@@ -63,19 +62,50 @@ std::string joined(const std::string& path, const char* name) {
     return path.empty() ? std::string(name) : path + '/' + name;
 }
 
+/// What the threads of a measurement share.
+struct Tree {
+    Tree(int rootOpened, const std::string& path, const UsageLog& usageLog)
+        : root(rootOpened), rootPath(path), log(usageLog), traits(traitsOf(rootOpened)) {}
+
+    /// Whether a name of a file with several is the first that is met.
+    bool isFirstName(ino_t inode) {
+        const platform::MutexLock held(mutex);
+        return seen.insert(inode).second;
+    }
+    void write(int level, const std::string& message) {
+        const platform::MutexLock held(mutex);
+        log.write(level, message);
+    }
+
+    const int root;
+    const std::string& rootPath;
+    const UsageLog& log;
+    const FileSystemTraits traits;
+    dev_t device = 0;
+    DirectoryQueue waiting;
+    platform::Mutex mutex;
+    std::unordered_set<ino_t> seen ZOR_GUARDED_BY(mutex);
+};
+
+/// One thread's part of it.
 class Measurement {
 public:
-    Measurement(int root, const std::string& rootPath, const UsageLog& log)
-        : root_(root), rootPath_(rootPath), log_(log), traits_(traitsOf(root)) {}
+    explicit Measurement(Tree& tree)
+        : tree_(tree), root_(tree.root), rootPath_(tree.rootPath), log_(tree.log), traits_(tree.traits),
+          device_(tree.device) {}
 
-    Usage run();
+    /// Measures directories until none waits. `met` is called after each.
+    void run(const std::function<void()>& met);
+    void noteChangeOf(int directory);
+    [[nodiscard]] const Usage& usage() const { return usage_; }
+    [[nodiscard]] std::uint64_t entries() const { return entries_; }
+    void sayUnopened(const std::string& path, int error);
 
 private:
     void measureDirectory(const std::string& path);
     void measureEntries(int directory, const std::string& path);
     [[nodiscard]] bool isInTree(int directory) const;
     void noteChange(const struct stat& status);
-    void noteChangeOf(int directory);
     void addDirectory(int directory, const std::string& path, const char* name);
     /// `makePath` is called only for a message.
     template <typename MakePath>
@@ -83,7 +113,6 @@ private:
     void measureDepthFirst(int parent, const std::string& path, const char* name);
     void addWalkEntry(const WalkEntry& entry, const std::string& top);
 
-    void sayUnopened(const std::string& path, int error);
     void sayUnexamined(const std::string& path, std::uint64_t index, int error);
     void sayEmpty(const std::string& path) const;
     [[nodiscard]] bool logs(int level) const { return log_.write && level <= log_.levelMax; }
@@ -91,35 +120,22 @@ private:
         return path.empty() ? rootPath_ : rootPath_ + '/' + path;
     }
 
+    Tree& tree_;
     const int root_;
     const std::string& rootPath_;
     const UsageLog& log_;
     const FileSystemTraits traits_;
-    dev_t device_ = 0;
+    const dev_t device_;
     Usage usage_;
-    std::unordered_set<ino_t> seen_;
-    /// Relative to the root, which is "".
-    std::deque<std::string> queue_;
-    std::size_t queuedBytes_ = 0;
+    std::uint64_t entries_ = 0;
     BulkDirectoryRead::Buffer buffer_;
 };
 
-Usage Measurement::run() {
-    struct stat status{};
-    if (::fstat(root_, &status) != 0 || ::lseek(root_, 0, SEEK_SET) < 0) {
-        sayUnopened({}, errno);
-        return usage_;
-    }
-    device_ = status.st_dev;
-    queue_.emplace_back();
-    while (!queue_.empty()) {
-        const std::string path = std::move(queue_.front());
-        queue_.pop_front();
-        queuedBytes_ -= path.size();
+void Measurement::run(const std::function<void()>& met) {
+    tree_.waiting.workOff([&](const std::string& path) {
         measureDirectory(path);
-    }
-    noteChangeOf(root_); // as it is after the walk
-    return usage_;
+        met();
+    });
 }
 
 void Measurement::noteChange(const struct stat& status) {
@@ -175,34 +191,29 @@ void Measurement::measureEntries(int directory, const std::string& path) {
             addDirectory(directory, path, entry->name);
         }
     }
+    entries_ += index;
     usage_.cutShort |= isOwnShortage(entries.error());
     if (entries.error() != 0 && logs(logLevelError))
-        log_.write(logLevelError,
-                   formatted("scanbatch on entry %llu in %s returned error %s", static_cast<unsigned long long>(index),
-                             ZOR_SHOWN(fullPath(path)), errorText(entries.error())));
+        tree_.write(logLevelError,
+                    formatted("scanbatch on entry %llu in %s returned error %s", static_cast<unsigned long long>(index),
+                              ZOR_SHOWN(fullPath(path)), errorText(entries.error())));
     // The end, where only the reading tells that there is nothing.
     if (index == 0 && entries.error() == 0 && !path.empty())
         sayEmpty(path);
 }
 
 void Measurement::addDirectory(int directory, const std::string& path, const char* name) {
-    std::string child = joined(path, name);
-    if (child.size() >= PATH_MAX || queue_.size() >= queuedDirectoriesMax ||
-        queuedBytes_ + child.size() > queuedBytesMax) {
+    if (!tree_.waiting.add(joined(path, name)))
         measureDepthFirst(directory, path, name);
-        return;
-    }
-    queuedBytes_ += child.size();
-    queue_.push_back(std::move(child));
 }
 
 template <typename MakePath>
 void Measurement::addNonDirectory(const struct stat& status, MakePath makePath) {
     noteChange(status);
-    if (status.st_nlink == 1 || seen_.insert(status.st_ino).second)
+    if (status.st_nlink == 1 || tree_.isFirstName(status.st_ino))
         usage_.bytes += static_cast<std::uint64_t>(status.st_blocks) * blockBytes;
     else if (logs(logLevelDebug))
-        log_.write(logLevelDebug, formatted("Skipping hardlinked file at %s", ZOR_SHOWN(fullPath(makePath()))));
+        tree_.write(logLevelDebug, formatted("Skipping hardlinked file at %s", ZOR_SHOWN(fullPath(makePath()))));
 }
 
 void Measurement::measureDepthFirst(int parent, const std::string& path, const char* name) {
@@ -250,26 +261,55 @@ void Measurement::addWalkEntry(const WalkEntry& entry, const std::string& top) {
 void Measurement::sayUnopened(const std::string& path, int error) {
     usage_.cutShort |= isOwnShortage(error);
     if (logs(logLevelError))
-        log_.write(logLevelError,
-                   formatted("Failed to open directory %s : %s", ZOR_SHOWN(fullPath(path)), errorText(error)));
+        tree_.write(logLevelError,
+                    formatted("Failed to open directory %s : %s", ZOR_SHOWN(fullPath(path)), errorText(error)));
 }
 
 void Measurement::sayUnexamined(const std::string& path, std::uint64_t index, int error) {
     usage_.cutShort |= isOwnShortage(error);
     if (logs(logLevelError))
-        log_.write(logLevelError, formatted("Got error %s while processing entry %llu in %s", errorText(error),
-                                            static_cast<unsigned long long>(index), ZOR_SHOWN(fullPath(path))));
+        tree_.write(logLevelError, formatted("Got error %s while processing entry %llu in %s", errorText(error),
+                                             static_cast<unsigned long long>(index), ZOR_SHOWN(fullPath(path))));
 }
 
 void Measurement::sayEmpty(const std::string& path) const {
     if (logs(logLevelDebug))
-        log_.write(logLevelDebug, formatted("skipping empty directory at %s", ZOR_SHOWN(fullPath(path))));
+        tree_.write(logLevelDebug, formatted("skipping empty directory at %s", ZOR_SHOWN(fullPath(path))));
 }
 
 } // namespace
 
 Usage diskUsage(int directory, const std::string& path, const UsageLog& log) {
-    return Measurement(directory, path, log).run();
+    Tree tree(directory, path, log);
+    struct stat status{};
+    const bool readable = ::fstat(directory, &status) == 0 && ::lseek(directory, 0, SEEK_SET) >= 0;
+    const int unreadable = readable ? 0 : errno;
+    tree.device = status.st_dev;
+    Measurement own(tree);
+    if (!readable) {
+        own.sayUnopened({}, unreadable);
+        return own.usage();
+    }
+    Usage others;
+    const std::function<void()> help = [&] {
+        const auto part = std::make_unique<Measurement>(tree);
+        part->run([] {});
+        others = part->usage();
+    };
+    Helpers helpers(1);
+    helpers.run([&] {
+        own.run([&] {
+            if (own.entries() >= entriesForTwoThreads && tree.waiting.hasWork())
+                helpers.add(help);
+        });
+    });
+    helpers.finish();
+    own.noteChangeOf(directory); // as it is after the walk
+    Usage usage = own.usage();
+    usage.bytes += others.bytes;
+    usage.cutShort |= others.cutShort;
+    usage.lastChange = std::max(usage.lastChange, others.lastChange);
+    return usage;
 }
 
 } // namespace zor::fs

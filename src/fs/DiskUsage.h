@@ -1,11 +1,11 @@
 // SPDX-License-Identifier: Apache-2.0
 // Allocated bytes of every non-directory below a directory, each hard-linked file counted once.
 //
-// Breadth first, one bulk read buffer for all directories, no recursion. The queue of directories is bounded; what does
-// not fit it, and what lies deeper than a path can name, is measured depth first on the spot, so width and depth are
-// bounded by nothing. The set of files seen grows only with files whose link count is not 1. Links are not followed and
-// other file systems not entered. Never fails: what cannot be read adds nothing and is said in the log. Any thread, any
-// number at once.
+// Breadth first, one bulk read buffer for each thread, no recursion; a second thread shares the directories of a large
+// tree. The queue of directories is bounded; what does not fit it, and what lies deeper than a path can name, is
+// measured depth first on the spot, so width and depth are bounded by nothing. The set of files seen grows only with
+// files whose link count is not 1. Links are not followed and other file systems not entered. Never fails: what cannot
+// be read adds nothing and is said in the log. Any thread, any number at once.
 #pragma once
 
 #include <chrono>
@@ -16,7 +16,7 @@
 namespace zor::fs {
 
 struct UsageLog {
-    /// Called with level 3 or 7 and the message. May be empty.
+    /// Called with level 3 or 7 and the message, by one thread at a time. May be empty.
     std::function<void(int level, const std::string& message)> write;
     /// Messages above this level are not even made.
     int levelMax = 3;

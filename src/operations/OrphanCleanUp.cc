@@ -2,7 +2,7 @@
 #include "operations/OrphanCleanUp.h"
 
 #include "fs/Names.h"
-#include "fs/Stretches.h"
+#include "fs/SharedWork.h"
 #include "store/Names.h"
 
 #include <array>

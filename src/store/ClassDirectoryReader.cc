@@ -4,7 +4,7 @@
 #include "base/Mutex.h"
 #include "fs/BulkDirectoryRead.h"
 #include "fs/PathResolver.h"
-#include "fs/Stretches.h"
+#include "fs/SharedWork.h"
 
 #include <cerrno>
 #include <iterator>

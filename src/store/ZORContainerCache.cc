@@ -3,6 +3,7 @@
 
 #include "base/Assert.h"
 #include "fs/PathResolver.h"
+#include "fs/SharedWork.h"
 #include "plist/Value.h"
 #include "store/Names.h"
 
@@ -116,11 +117,11 @@ Result<void> ZORContainerCache::checkOnDisk(Here here, const Key& key, const Fou
         return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
                          "Cache: %s%s: nil URL from %s", className(key.containerClass), suffix(key.transient),
                          "(null)");
-    const FileURL file = found.place.url().appendingFile(names::metadataFile);
     if (missing == 0) {
         traceIdentifier(here, key, foundFormatPrefix, found.record->identifier());
         return {};
     }
+    const FileURL file = found.place.url().appendingFile(names::metadataFile);
     if (missing != ENOENT && missing != isNoFile)
         log_.write(logLevelError, "itemExistsAtURL", "Failed to determine if %s exists: %s", file.c_str(),
                    errorText(missing));
@@ -249,10 +250,16 @@ ZORContainerCache::allContainersForUser(std::uint32_t userId, ContainerClass con
 
 Result<std::vector<ZORContainerCache::Record>>
 ZORContainerCache::thoseOnDisk(Here here, const Key& key, std::vector<Found> found, std::uint64_t homeGeneration) {
+    std::vector<int> missing(found.size());
+    fs::forEachStretch(found.size(), [&](std::size_t begin, std::size_t end) {
+        for (std::size_t i = begin; i < end; ++i)
+            missing[i] = lookForFile(found[i].place.url());
+    });
     std::vector<Record> records;
     records.reserve(found.size());
-    for (Found& one : found) {
-        const auto there = checkOnDisk(here, key, one, lookForFile(one.place.url()), "ALL Found");
+    for (std::size_t i = 0; i < found.size(); ++i) {
+        Found& one = found[i];
+        const auto there = checkOnDisk(here, key, one, missing[i], "ALL Found");
         if (!there && isLeftOpen(there.error(), key))
             return there.error();
         if (there)

@@ -68,7 +68,7 @@ inline std::string chainPath(std::size_t depth) {
 class World {
 public:
     static constexpr std::size_t chainDepth = 60;
-    static constexpr std::size_t wideCount = 50;
+    static constexpr std::size_t wideCount = 150;
     /// Content of every file outside, and the size of one of them in bytes.
     static constexpr const char* secret = "SECRET";
     static constexpr off_t outsideBytes = 8 * 1024 * 1024;
