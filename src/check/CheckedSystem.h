@@ -38,6 +38,7 @@ public:
     int removeDirectory(int, const char*) override { return -EROFS; }
     int changeMode(int, mode_t) override { return -EROFS; }
     int changeOwner(int, uid_t, gid_t) override { return -EROFS; }
+    int changeOwnerOf(int, const char*, uid_t, gid_t) override { return -EROFS; }
     int setTimes(int, const timespec&, const timespec&) override { return -EROFS; }
     int setAttribute(int, const char*, std::span<const std::uint8_t>) override { return -EROFS; }
     int setInodeFlags(int, int) override { return -EROFS; }

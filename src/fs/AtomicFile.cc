@@ -20,6 +20,7 @@ namespace {
 
 constexpr std::size_t randomCharacters = 6;
 constexpr int namesTriedMax = 16;
+constexpr mode_t permissionBits = 07777;
 
 constexpr std::string_view temporaryMark = ".new-";
 /// The one name that a target's writes use, so that the next one finds what a stop left of the last: looking for it
@@ -52,7 +53,11 @@ int writeNewFile(platform::Disk& disk, int directory, const char* name, mode_t m
     FileDescriptor file(disk.createFile(directory, name, mode));
     if (!file.valid())
         return file.get();
-    int status = disk.changeMode(file.get(), mode);
+    // The process's umask, or what the directory hands down, may have changed it.
+    struct stat made{};
+    int status = ::fstat(file.get(), &made) != 0 ? -errno : 0;
+    if (status == 0 && (made.st_mode & permissionBits) != mode)
+        status = disk.changeMode(file.get(), mode);
     if (status == 0)
         status = disk.write(file.get(), bytes);
     return status < 0 ? status : file.release();

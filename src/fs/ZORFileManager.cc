@@ -108,6 +108,10 @@ Result<void> ZORFileManager::judgeOwner(int directory, const FileURL& url, std::
     struct stat status{};
     if (::fstat(directory, &status) != 0)
         return posixError(ZOR_HERE, errno, "Failed to determine if %s exists: %s", url.c_str(), errorText(errno));
+    return judgeOwner(status, url, owner);
+}
+
+Result<void> ZORFileManager::judgeOwner(const struct stat& status, const FileURL& url, std::uint32_t owner) const {
     if (status.st_uid != ownerToBe(owner))
         return posixError(ZOR_HERE, EPERM,
                           "%s belongs to user %u instead of user %u, so it stays as it is; move it away, and it is "
@@ -130,15 +134,15 @@ uid_t ZORFileManager::ownerToBe(std::uint32_t owner) const {
 
 Result<void> ZORFileManager::mendDirectory(int directory, const FileURL& url, const DirectoryAttributes& attributes) {
     struct stat status{};
-    if (attributes.otherOwner != ownerUnchanged && ::fstat(directory, &status) == 0 &&
-        status.st_uid == attributes.otherOwner)
-        return {};
-    TRY(judgeOwner(directory, url, attributes.owner));
-    if (attributes.protectionClass != protectionClassUnchanged)
-        TRY(setDirectoryClass(directory, url.path(), attributes.protectionClass));
-    struct stat parent{};
     if (::fstat(directory, &status) != 0)
-        return posixError(ZOR_HERE, errno, "opendir of %s failed: %s", url.c_str(), errorText(errno));
+        return posixError(ZOR_HERE, errno, "Failed to determine if %s exists: %s", url.c_str(), errorText(errno));
+    if (attributes.otherOwner != ownerUnchanged && status.st_uid == attributes.otherOwner)
+        return {};
+    TRY(judgeOwner(status, url, attributes.owner));
+    const int protectionClass = attributes.protectionClass;
+    if (protectionClass != protectionClassUnchanged)
+        TRY(classSet(setClassAtCreation(directory, protectionClass), url.path(), protectionClass));
+    struct stat parent{};
     const bool groupFits = attributes.owner == ownerUnchanged || status.st_gid == attributes.owner;
     const mode_t mode = status.st_mode & permissionBits;
     if (groupFits && mode == attributes.mode)
@@ -209,8 +213,9 @@ Result<FileDescriptor> ZORFileManager::makeNewDirectory(const Base& base, std::s
 
 Result<void> ZORFileManager::giveNewDirectory(int directory, const std::string& path,
                                               const DirectoryAttributes& attributes) {
-    if (attributes.protectionClass != protectionClassUnchanged)
-        TRY(setDirectoryClass(directory, path, attributes.protectionClass));
+    const int protectionClass = attributes.protectionClass;
+    if (protectionClass != protectionClassUnchanged)
+        TRY(classSet(setClassOfNew(directory, protectionClass), path, protectionClass));
     // One that could not be given would be another's for ever once it had its name.
     int status = disk_.changeMode(directory, attributes.mode);
     const char* verb = "chmod";
@@ -223,8 +228,8 @@ Result<void> ZORFileManager::giveNewDirectory(int directory, const std::string& 
     return {};
 }
 
-Result<void> ZORFileManager::setDirectoryClass(int directory, const std::string& path, int protectionClass) {
-    if (const int failure = setClassAtCreation(directory, protectionClass))
+Result<void> ZORFileManager::classSet(int failure, const std::string& path, int protectionClass) {
+    if (failure != 0)
         return posixError(ZOR_HERE, failure, "Failed to setclass(%d) on directory %s: %s", protectionClass,
                           path.c_str(), errorText(failure));
     return {};
@@ -232,13 +237,19 @@ Result<void> ZORFileManager::setDirectoryClass(int directory, const std::string&
 
 int ZORFileManager::setClassAtCreation(int directory, int protectionClass) {
     const auto current = protection_.classOf(directory);
-    if (current && *current == protectionClass)
-        return 0;
-    const int failure = protection_.setClass(directory, protectionClass).number();
+    return current && *current == protectionClass ? 0 : setClass(directory, protectionClass);
+}
+
+int ZORFileManager::setClassOfNew(int fd, int protectionClass) {
+    return protectionClass == platform::defaultProtectionClass ? 0 : setClass(fd, protectionClass);
+}
+
+int ZORFileManager::setClass(int fd, int protectionClass) {
+    const int failure = protection_.setClass(fd, protectionClass).number();
     if (failure != ENOTSUP)
         return failure;
     if (!saidClassesUnsupported_.exchange(true))
-        log_.write(logLevelNotice, __func__,
+        log_.write(logLevelNotice, "setClassAtCreation",
                    "The file system keeps no extended attributes; new directories have no protection class");
     return 0;
 }

@@ -79,6 +79,7 @@ public:
     /// Whether an open directory belongs to the user (the daemon, for ownerUnchanged); EPERM else. A daemon that is not
     /// root gives nothing away: there it has to be the daemon's own.
     Result<void> judgeOwner(int directory, const FileURL& url, std::uint32_t owner) const;
+    Result<void> judgeOwner(const struct stat& directory, const FileURL& url, std::uint32_t owner) const;
     /// Opens a directory for reading its entries and acting on it, and judges its owner.
     Result<platform::FileDescriptor> openDirectoryOf(std::uint32_t owner, const FileURL& url) const;
     /// A new directory "temp." and six characters, mode 0700 and the daemon's own.
@@ -165,6 +166,8 @@ public:
     /// Sets a class at the creation of a directory; a file system without classes is said once and is no failure.
     /// 0 or an errno.
     int setClassAtCreation(int directory, int protectionClass);
+    /// The same for what this process has just made, which has no recorded class.
+    int setClassOfNew(int fd, int protectionClass);
 
 private:
     enum class MissingSource { fails, isFine };
@@ -198,7 +201,10 @@ private:
     Result<void> giveNewDirectory(int directory, const std::string& path, const DirectoryAttributes& attributes);
     /// To one that was there: judges it first.
     Result<void> mendDirectory(int directory, const FileURL& url, const DirectoryAttributes& attributes);
-    Result<void> setDirectoryClass(int directory, const std::string& path, int protectionClass);
+    /// 0 or an errno.
+    int setClass(int fd, int protectionClass);
+    /// The error for which a class could not be set.
+    static Result<void> classSet(int failure, const std::string& path, int protectionClass);
     /// The user to whom a directory for `owner` belongs in the end.
     [[nodiscard]] uid_t ownerToBe(std::uint32_t owner) const;
     struct Standard {

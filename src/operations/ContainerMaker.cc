@@ -4,17 +4,19 @@
 #include "base/BlockingScope.h"
 #include "fs/AtomicFile.h"
 #include "fs/DictionaryFile.h"
+#include "fs/ItemStatus.h"
 #include "os/FileDescriptor.h"
 #include "os/Openat2.h"
 #include "plist/Binary.h"
 #include "store/ContainerLayout.h"
 #include "store/Names.h"
 
+#include <algorithm>
 #include <cerrno>
-#include <cstring>
 #include <fcntl.h>
 #include <new>
 #include <string_view>
+#include <sys/stat.h>
 #include <utility>
 #include <vector>
 
@@ -26,15 +28,17 @@ using platform::openBeneath;
 namespace {
 
 constexpr mode_t closedMode = 0700;
+constexpr mode_t permissionBits = 07777;
 constexpr const char* function = "createOrLookupContainerForUser";
 constexpr mode_t metadataMode = 0644;
 
 class ContainerBuilder {
 public:
-    /// Builds `staging` (whose parent exists) by the layout. `staging` has not been made yet.
-    ContainerBuilder(const Log& log, ZORFileManager& fileManager, FileURL staging, const ContainerLayout& layout)
-        : log_(log), fileManager_(fileManager), disk_(fileManager.disk()), staging_(std::move(staging)),
-          layout_(layout) {}
+    /// Builds `staging`, which has not been made yet, by the layout. `parent` is the open directory that it lies in.
+    ContainerBuilder(const Log& log, ZORFileManager& fileManager, int parent, FileURL staging,
+                     const ContainerLayout& layout)
+        : log_(log), fileManager_(fileManager), disk_(fileManager.disk()), parent_(parent),
+          staging_(std::move(staging)), layout_(layout) {}
 
     /// The container's own directory. Error 7.
     Result<void> _createTopLevelContainerDirectory();
@@ -48,19 +52,28 @@ public:
     Result<void> orderBeforeMove(const fs::Durability& durability);
 
 private:
+    struct Made {
+        int parent = -1;
+        /// In it.
+        const char* name = nullptr;
+        /// Only of a directory that others of the layout lie in.
+        platform::FileDescriptor opened;
+    };
     /// The descriptor of a subdirectory that a deeper one lies in: the layout names it first.
     [[nodiscard]] int madeBefore(std::string_view subdirectory) const;
+    [[nodiscard]] bool holdsOthers(std::string_view subdirectory) const;
     ZORError topLevelError(Here here, int number, const char* verb);
     ZORError subdirectoryError(Here here, const char* subdirectory, int number, const char* verb);
-    Result<void> attributesOf(int directory, mode_t mode, std::uint32_t owner, const char* subdirectory);
+    Result<void> giveAway(const Made& made, const char* subdirectory);
 
     const Log& log_;
     ZORFileManager& fileManager_;
     platform::Disk& disk_;
+    const int parent_;
     const FileURL staging_;
     const ContainerLayout layout_;
     platform::FileDescriptor directory_;
-    std::vector<platform::FileDescriptor> subdirectories_; // in the layout's order
+    std::vector<Made> subdirectories_; // in the layout's order
     platform::FileDescriptor metadata_;
 };
 
@@ -78,17 +91,14 @@ ZORError ContainerBuilder::subdirectoryError(Here here, const char* subdirectory
 }
 
 Result<void> ContainerBuilder::_createTopLevelContainerDirectory() {
-    auto parent = fileManager_.resolver().openParent(staging_);
-    if (!parent)
-        return topLevelError(ZOR_HERE, parent.error().number(), "open of the parent");
-    const char* name = parent->name.c_str();
-    if (const int made = disk_.makeDirectory(parent->directory.get(), name, closedMode); made < 0)
+    const std::string name(staging_.lastPathComponent());
+    if (const int made = disk_.makeDirectory(parent_, name.c_str(), closedMode); made < 0)
         return topLevelError(ZOR_HERE, -made, "mkdir");
-    auto directory = openBeneath(parent->directory.get(), name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
+    auto directory = openBeneath(parent_, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!directory)
         return topLevelError(ZOR_HERE, directory.error().number(), "opendir");
     directory_ = std::move(*directory);
-    if (const int failed = fileManager_.setClassAtCreation(directory_.get(), layout_.topLevelProtectionClass))
+    if (const int failed = fileManager_.setClassOfNew(directory_.get(), layout_.topLevelProtectionClass))
         return topLevelError(ZOR_HERE, failed, "setclass");
     return {};
 }
@@ -96,8 +106,15 @@ Result<void> ContainerBuilder::_createTopLevelContainerDirectory() {
 int ContainerBuilder::madeBefore(std::string_view subdirectory) const {
     for (std::size_t i = 0; i < subdirectories_.size(); ++i)
         if (layout_.subdirectories[i] == subdirectory)
-            return subdirectories_[i].get();
+            return subdirectories_[i].opened.get();
     return -1; // a layout that names it too late; making anything there fails
+}
+
+bool ContainerBuilder::holdsOthers(std::string_view subdirectory) const {
+    return std::ranges::any_of(layout_.subdirectories, [&](std::string_view other) {
+        return other.size() > subdirectory.size() && other.starts_with(subdirectory) &&
+               other[subdirectory.size()] == '/';
+    });
 }
 
 Result<void> ContainerBuilder::_createSubDirectories() {
@@ -107,12 +124,15 @@ Result<void> ContainerBuilder::_createSubDirectories() {
         const std::size_t slash = path.rfind('/');
         const int parent = slash == path.npos ? directory_.get() : madeBefore(path.substr(0, slash));
         const char* name = subdirectory + (slash == path.npos ? 0 : slash + 1);
-        if (const int made = disk_.makeDirectory(parent, name, closedMode); made < 0)
+        if (const int made = disk_.makeDirectory(parent, name, layout_.subdirectoryMode); made < 0)
             return subdirectoryError(ZOR_HERE, subdirectory, -made, "mkdir");
+        Made& made = subdirectories_.emplace_back(Made{.parent = parent, .name = name, .opened = {}});
+        if (!holdsOthers(path))
+            continue;
         auto opened = openBeneath(parent, name, O_PATH | O_DIRECTORY | O_NOFOLLOW);
         if (!opened)
             return subdirectoryError(ZOR_HERE, subdirectory, opened.error().number(), "opendir");
-        subdirectories_.push_back(std::move(*opened));
+        made.opened = std::move(*opened);
     }
     return {};
 }
@@ -125,7 +145,7 @@ Result<void> ContainerBuilder::writeMetadata(const ZORMetadata& record) {
         status = fs::writeNewFile(disk_, directory_.get(), names::metadataFile, metadataMode, *bytes);
     if (status >= 0) {
         metadata_ = FileDescriptor(status);
-        status = -fileManager_.setClassAtCreation(metadata_.get(), classWithoutProtection);
+        status = -fileManager_.setClassOfNew(metadata_.get(), classWithoutProtection);
     }
     if (status >= 0)
         return {};
@@ -135,24 +155,34 @@ Result<void> ContainerBuilder::writeMetadata(const ZORMetadata& record) {
                      "Failed to write metadata dictionary to URL %s", staging_.c_str());
 }
 
-Result<void> ContainerBuilder::attributesOf(int directory, mode_t mode, std::uint32_t owner, const char* subdirectory) {
-    int status = owner == ownerUnchanged ? 0 : disk_.changeOwner(directory, owner, owner);
-    const char* verb = "chown";
-    if (status == 0) {
-        status = disk_.changeMode(directory, mode);
+Result<void> ContainerBuilder::giveAway(const Made& made, const char* subdirectory) {
+    struct stat status{};
+    int failure = fs::statusOfName(made.parent, made.name, status);
+    const char* verb = "lstat";
+    // The process's umask, or what the directory hands down, may have changed the mode.
+    if (failure == 0 && (status.st_mode & permissionBits) != layout_.subdirectoryMode) {
+        const auto opened = openBeneath(made.parent, made.name, O_PATH | O_DIRECTORY | O_NOFOLLOW);
+        failure = opened ? -disk_.changeMode(opened->get(), layout_.subdirectoryMode) : opened.error().number();
         verb = "chmod";
     }
-    if (status == 0)
-        return {};
-    return subdirectory ? subdirectoryError(ZOR_HERE, subdirectory, -status, verb)
-                        : topLevelError(ZOR_HERE, -status, verb);
+    if (const std::uint32_t owner = layout_.subdirectoryOwner; failure == 0 && owner != ownerUnchanged) {
+        failure = -disk_.changeOwnerOf(made.parent, made.name, owner, owner);
+        verb = "chown";
+    }
+    return failure == 0 ? Result<void>() : subdirectoryError(ZOR_HERE, subdirectory, failure, verb);
 }
 
 Result<void> ContainerBuilder::giveAway() {
     for (std::size_t i = subdirectories_.size(); i-- > 0;)
-        TRY(attributesOf(subdirectories_[i].get(), layout_.subdirectoryMode, layout_.subdirectoryOwner,
-                         layout_.subdirectories[i]));
-    return attributesOf(directory_.get(), layout_.topLevelMode, layout_.topLevelOwner, nullptr);
+        TRY(giveAway(subdirectories_[i], layout_.subdirectories[i]));
+    const std::uint32_t owner = layout_.topLevelOwner;
+    int status = owner == ownerUnchanged ? 0 : disk_.changeOwner(directory_.get(), owner, owner);
+    const char* verb = "chown";
+    if (status == 0) {
+        status = disk_.changeMode(directory_.get(), layout_.topLevelMode);
+        verb = "chmod";
+    }
+    return status == 0 ? Result<void>() : topLevelError(ZOR_HERE, -status, verb);
 }
 
 Result<void> ContainerBuilder::orderBeforeMove(const fs::Durability& durability) {
@@ -186,15 +216,22 @@ auto ContainerMaker::orCleanUp(const FileURL& staging, Step&& step) -> decltype(
 
 Result<ContainerMaker::Built> ContainerMaker::build(std::uint32_t userId, const std::string& identifier,
                                                     ContainerClass containerClass) {
-    FileURL staging = needs_.configuration.stagingDirectory().appendingDirectory(UUID::random().string());
+    UsableDirectory directory = needs_.configuration.openStagingDirectory();
+    FileURL staging = directory.url.appendingDirectory(UUID::random().string());
+    if (!directory.opened)
+        return makeError(needs_.log, {function, __LINE__}, ErrorCode::stagingDirectoryFailed, &directory.opened.error(),
+                         LogFlag::yes, "Failed to create staging dir at %s : %s", staging.c_str(),
+                         directory.opened.error().text().c_str());
     auto record = std::make_shared<ZORMetadata>(userId, UUID::random(), containerClass, identifier, nullptr,
                                                 ContainerPlace(staging));
     record->setDurable(false);
-    TRY(orCleanUp(staging, [&] { return buildIn(staging, *record); }));
-    return Built{.record = std::move(record), .staging = std::move(staging)};
+    TRY(orCleanUp(staging, [&] { return buildIn(directory.opened->get(), staging, *record); }));
+    return Built{
+        .record = std::move(record), .staging = std::move(staging), .stagingDirectory = std::move(*directory.opened)};
 }
 
-Result<FileURL> ContainerMaker::putInPlace(const Built& built, bool transient, std::uint64_t homeGeneration) {
+Result<ContainerMaker::Placed> ContainerMaker::putInPlace(const Built& built, bool transient,
+                                                          std::uint64_t homeGeneration) {
     return orCleanUp(built.staging, [&] { return moveIntoPlace(built, transient, homeGeneration); });
 }
 
@@ -206,8 +243,9 @@ void ContainerMaker::discard(const Built& built) noexcept {
     }
 }
 
-Result<void> ContainerMaker::buildIn(const FileURL& staging, const ZORMetadata& record) {
-    ContainerBuilder builder(needs_.log, needs_.fileManager, staging, layoutOf(record.containerClass(), record.uid()));
+Result<void> ContainerMaker::buildIn(int stagingDirectory, const FileURL& staging, const ZORMetadata& record) {
+    ContainerBuilder builder(needs_.log, needs_.fileManager, stagingDirectory, staging,
+                             layoutOf(record.containerClass(), record.uid()));
     TRY(builder._createTopLevelContainerDirectory());
     TRY(builder._createSubDirectories());
     TRY(builder.writeMetadata(record));
@@ -216,7 +254,8 @@ Result<void> ContainerMaker::buildIn(const FileURL& staging, const ZORMetadata& 
     return builder.orderBeforeMove(needs_.durability);
 }
 
-Result<FileURL> ContainerMaker::moveIntoPlace(const Built& built, bool transient, std::uint64_t homeGeneration) {
+Result<ContainerMaker::Placed> ContainerMaker::moveIntoPlace(const Built& built, bool transient,
+                                                             std::uint64_t homeGeneration) {
     const FileURL& staging = built.staging;
     const std::uint32_t userId = built.record->uid();
     const ContainerClass containerClass = built.record->containerClass();
@@ -225,27 +264,23 @@ Result<FileURL> ContainerMaker::moveIntoPlace(const Built& built, bool transient
     const std::string* wellKnown =
         transient ? nullptr : needs_.whitelist.wellknownContainerForId(built.record->identifier(), containerClass);
     FileURL live;
-    const auto moved = [&]() -> Result<void> {
-        const auto classDirectory = needs_.configuration.openClassDirectory(userId, containerClass, transient);
+    auto moved = [&]() -> Result<Placed> {
+        auto classDirectory = needs_.configuration.openClassDirectory(userId, containerClass, transient);
         // A container that was looked for in one home is not made in another.
         const UserHome* const home = isPerUserClass(containerClass) ? needs_.configuration.homeOf(userId) : nullptr;
         if (!classDirectory || (home && home->generation() != homeGeneration))
             return posixError(here, ENOENT, "the home of user %u is not there, or has just changed", userId);
         live = classDirectory->url.appendingDirectory(wellKnown ? std::string_view(*wellKnown)
                                                                 : staging.lastPathComponent());
-        const auto from = needs_.fileManager.resolver().openParent(staging);
-        if (!from)
-            return posixError(here, from.error(), "rename of %s to %s failed: %s", staging.c_str(), live.c_str(),
-                              errorText(from.error()));
         if (!classDirectory->opened)
             return classDirectory->opened.error();
-        TRY(needs_.fileManager.moveItem(from->directory.get(), staging, classDirectory->opened->get(), live));
-        return {};
+        TRY(needs_.fileManager.moveItem(built.stagingDirectory.get(), staging, classDirectory->opened->get(), live));
+        return Placed{.url = live, .classDirectory = std::move(*classDirectory->opened)};
     }();
     if (!moved)
         return makeError(needs_.log, here, ErrorCode::moveToLiveFailed, &moved.error(), LogFlag::yes,
                          "Failed to move staging dir: %s to live dir: %s", staging.c_str(), live.c_str());
-    return live;
+    return moved;
 }
 
 } // namespace zor

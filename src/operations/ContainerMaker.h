@@ -1,9 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 // Builds one container in the staging directory, complete, and moves it into its class directory with one move.
 //
-// Everything is made as the daemon's own, closed to others, and given its mode and owner in a last pass, from the
-// deepest directory up: at no moment can the future owner, or anybody whom a mode lets in, reach a directory that the
-// daemon still works in. What is made is worked on through descriptors.
+// Everything is made as the daemon's own, in a directory that is closed to all others until the end, and given its
+// owner in a last pass, from the deepest directory up, that directory last: at no moment can the future owner, or
+// anybody whom a mode lets in, reach a directory that the daemon still works in. So nobody else can name anything
+// there, and what has just been made is found by its name.
 //
 // Unlike a directory getter, a container is not there by halves: a mode or an owner that cannot be set fails the build.
 //
@@ -44,19 +45,26 @@ public:
         /// Its place is the one in staging, and it is not durable.
         std::shared_ptr<ZORMetadata> record;
         FileURL staging;
+        /// The directory that holds it there.
+        platform::FileDescriptor stagingDirectory;
+    };
+    struct Placed {
+        FileURL url;
+        /// The class directory that it was moved into.
+        platform::FileDescriptor classDirectory;
     };
     /// Needs no lock, and is dear: the disk is waited for. Errors 6, 7, 34; or 9 when what was begun could not be moved
     /// away.
     Result<Built> build(std::uint32_t userId, const std::string& identifier, ContainerClass containerClass);
     /// Moves it into its class directory, and gives its place there. `homeGeneration`: of the home in which the
     /// container was looked for and not found. Error 8; or 9 as above: it is not in staging any more, whatever happens.
-    Result<FileURL> putInPlace(const Built& built, bool transient, std::uint64_t homeGeneration);
+    Result<Placed> putInPlace(const Built& built, bool transient, std::uint64_t homeGeneration);
     /// Moves one away that is not needed. One that cannot be moved is swept from staging at the next launch.
     void discard(const Built& built) noexcept;
 
 private:
-    Result<void> buildIn(const FileURL& staging, const ZORMetadata& record);
-    Result<FileURL> moveIntoPlace(const Built& built, bool transient, std::uint64_t homeGeneration);
+    Result<void> buildIn(int stagingDirectory, const FileURL& staging, const ZORMetadata& record);
+    Result<Placed> moveIntoPlace(const Built& built, bool transient, std::uint64_t homeGeneration);
     /// The value of `step`; when that fails or throws, what is in staging is moved away first.
     template <typename Step>
     auto orCleanUp(const FileURL& staging, Step&& step) -> decltype(step());

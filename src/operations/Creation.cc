@@ -57,6 +57,7 @@ Result<FoundContainer> Creation::createOrLookupContainerForUser(const Caller& ca
             found = TRY(lookedFor(wanted, &built.container));
         }
         TRY(makeDurable(*found));
+        found->movedInto = nullptr;
         return std::move(*found);
     });
 }
@@ -175,10 +176,10 @@ Result<void> Creation::discardTransient(const ZORMetadata& record, const std::st
 Result<FoundContainer> Creation::create(const Wanted& wanted, std::optional<ContainerMaker::Built>* built,
                                         std::uint64_t homeGeneration) {
     const bool transient = wanted.options.transient;
-    const ContainerMaker::Built mine =
-        built && *built ? *std::exchange(*built, std::nullopt)
-                        : TRY(needs_.maker.build(wanted.userId, wanted.identifier, wanted.containerClass));
-    const FileURL live = TRY(needs_.maker.putInPlace(mine, transient, homeGeneration));
+    ContainerMaker::Built mine = built && *built
+                                     ? *std::exchange(*built, std::nullopt)
+                                     : TRY(needs_.maker.build(wanted.userId, wanted.identifier, wanted.containerClass));
+    auto [live, classDirectory] = TRY(needs_.maker.putInPlace(mine, transient, homeGeneration));
     const auto& record = mine.record;
     record->setExisted(false);
     record->setTransient(transient);
@@ -187,14 +188,18 @@ Result<FoundContainer> Creation::create(const Wanted& wanted, std::optional<Cont
         return makeError(needs_.log, {function, __LINE__}, ErrorCode::cacheAddFailed, &added.error(), LogFlag::yes,
                          "Failed to add to cache for %u : %s, url: %s, transient: %d", wanted.userId,
                          ZOR_SHOWN(wanted.identifier), live.c_str(), transient);
-    return snapshot(record);
+    FoundContainer made = snapshot(record);
+    made.movedInto = std::make_shared<const platform::FileDescriptor>(std::move(classDirectory));
+    return made;
 }
 
 Result<void> Creation::makeDurable(const FoundContainer& container) {
     if (container.record->durable())
         return {};
     const FileURL live = FileURL::directory(container.path);
-    if (const auto failed = needs_.moves.syncDirectories({live.deletingLastPathComponent()}))
+    const auto failed = container.movedInto ? needs_.moves.syncDirectory(*container.movedInto, live)
+                                            : needs_.moves.syncDirectories({live.deletingLastPathComponent()});
+    if (failed)
         return needs_.moves.notLasting(function, ErrorCode::moveToLiveFailed, live, *failed);
     container.record->setDurable(true);
     return {};

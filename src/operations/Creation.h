@@ -37,6 +37,8 @@ struct FoundContainer {
     UUID uuid;
     std::string path;
     bool existed = false;
+    /// Of one that was just made: the directory that it was moved into.
+    std::shared_ptr<const platform::FileDescriptor> movedInto = nullptr;
 };
 
 struct CreateOrLookupOptions {

@@ -2,8 +2,10 @@
 #include "operations/LastingMoves.h"
 
 #include "base/BlockingScope.h"
+#include "os/Openat2.h"
 
 #include <algorithm>
+#include <fcntl.h>
 
 namespace zor {
 
@@ -18,6 +20,17 @@ std::optional<ZORError> LastingMoves::syncDirectories(std::vector<FileURL> chang
         if (status < 0)
             return posixError(ZOR_HERE, -status, "sync of %s failed: %s", url.c_str(), errorText(-status));
     }
+    return std::nullopt;
+}
+
+std::optional<ZORError> LastingMoves::syncDirectory(const platform::FileDescriptor& directory,
+                                                    const FileURL& moved) const {
+    const platform::BlockingScope blocking;
+    const auto listing = platform::openBeneath(directory.get(), ".", O_RDONLY | O_DIRECTORY);
+    const int status = listing ? durability_.afterMove(listing->get()) : -listing.error().number();
+    if (status < 0)
+        return posixError(ZOR_HERE, -status, "sync of %s failed: %s", moved.deletingLastPathComponent().c_str(),
+                          errorText(-status));
     return std::nullopt;
 }
 

@@ -24,6 +24,9 @@ public:
 
     /// Makes what was moved into or out of these directories durable; the error is not logged.
     [[nodiscard]] std::optional<ZORError> syncDirectories(std::vector<FileURL> changed) const;
+    /// The same of the open directory that holds `moved`; O_PATH will do.
+    [[nodiscard]] std::optional<ZORError> syncDirectory(const platform::FileDescriptor& directory,
+                                                        const FileURL& moved) const;
     /// A change in one directory is on the disk before the next one in the other can be. 0 or a negative errno.
     [[nodiscard]] int orderBetween(const FileURL& changed, const FileURL& next) const;
     /// The error of a container whose move into its place could not be synced, logged. The record says so until one is.

@@ -93,6 +93,12 @@ int LinuxDisk::changeOwner(int fd, uid_t uid, gid_t gid) {
     return checked([&] { return ::fchownat(fd, "", uid, gid, AT_EMPTY_PATH | AT_SYMLINK_NOFOLLOW); });
 }
 
+int LinuxDisk::changeOwnerOf(int directory, const char* name, uid_t uid, gid_t gid) {
+    if (!ownershipCanChange_)
+        return 0;
+    return checked([&] { return ::fchownat(directory, name, uid, gid, AT_SYMLINK_NOFOLLOW); });
+}
+
 int LinuxDisk::setTimes(int fd, const timespec& access, const timespec& modification) {
     const timespec times[2] = {access, modification};
     return checked([&] { return ::utimensat(fd, "", times, AT_EMPTY_PATH); });

@@ -23,8 +23,9 @@ public:
     int removeDirectory(int directory, const char* name) override;
 
     int changeMode(int fd, mode_t mode) override;
-    /// Does nothing, with success, when the process is not root.
+    /// These two do nothing, with success, when the process is not root.
     int changeOwner(int fd, uid_t uid, gid_t gid) override;
+    int changeOwnerOf(int directory, const char* name, uid_t uid, gid_t gid) override;
     int setTimes(int fd, const timespec& access, const timespec& modification) override;
     int setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) override;
     int setInodeFlags(int fd, int flags) override;

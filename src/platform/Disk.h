@@ -38,6 +38,8 @@ public:
     // Inodes. `fd` may be an O_PATH descriptor for changeMode, changeOwner and setAttribute.
     virtual int changeMode(int fd, mode_t mode) = 0;
     virtual int changeOwner(int fd, uid_t uid, gid_t gid) = 0;
+    /// The same of a name, for a directory in which nobody else can name anything.
+    virtual int changeOwnerOf(int directory, const char* name, uid_t uid, gid_t gid) = 0;
     virtual int setTimes(int fd, const timespec& access, const timespec& modification) = 0;
     virtual int setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) = 0;
     /// The inode flags of FS_IOC_SETFLAGS (FS_IMMUTABLE_FL and its kin).

@@ -65,21 +65,25 @@ UserHome::Seen UserHome::seenOf(const Found& found) const {
     return {.state = found.state, .directory = found.directory, .generation = generation()};
 }
 
-UserHome::Seen UserHome::look() {
+UserHome::Opened UserHome::lookAndOpen() {
     Found before;
     {
         const MutexLock held(mutex_);
         before = found_;
     }
     // The database is asked when there is nothing yet, or when what it named has changed.
-    const auto opened = before.directory ? resolver_.openDirectoryPath(*before.directory) : Errno(ENOENT);
+    auto opened = before.directory ? resolver_.openDirectoryPath(*before.directory) : Errno(ENOENT);
     const auto id = opened ? fs::directoryIdOf(opened->get()) : opened.error();
-    Found now = id && *id == before.id ? before : find();
+    const bool same = id && *id == before.id;
+    Found now = same ? before : find();
+    if (!same)
+        opened = now.directory ? resolver_.openDirectoryPath(*now.directory) : Errno(ENOENT);
     const MutexLock held(mutex_);
     dueMilliseconds_ = now.state == State::present ? coarseMilliseconds() + lookEveryMilliseconds : 0;
     // A look that fails leaves the state that was known.
     if (now.state == State::unknown)
-        return {.state = State::unknown, .directory = {}, .generation = generation()};
+        return {.seen = {.state = State::unknown, .directory = {}, .generation = generation()},
+                .directory = std::move(opened)};
     if (!now.isAs(found_)) {
         if (found_.state != State::unknown)
             log_.write(logLevelNotice, "UserHome", "The home of user %u is now %s", userId_,
@@ -87,7 +91,7 @@ UserHome::Seen UserHome::look() {
         found_ = std::move(now);
         generation_.fetch_add(1, std::memory_order_acq_rel);
     }
-    return seenOf(found_);
+    return {.seen = seenOf(found_), .directory = std::move(opened)};
 }
 
 UserHome::Seen UserHome::lookIfDue() {

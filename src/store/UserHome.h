@@ -50,7 +50,13 @@ public:
         std::uint64_t generation = 0;
     };
     /// Asks the disk.
-    Seen look() ZOR_EXCLUDES(mutex_);
+    Seen look() ZOR_EXCLUDES(mutex_) { return lookAndOpen().seen; }
+    struct Opened {
+        Seen seen;
+        /// The home that was seen, O_PATH, or an errno.
+        fs::OpenResult directory;
+    };
+    Opened lookAndOpen() ZOR_EXCLUDES(mutex_);
     /// The same, but a home that was seen within the last second is taken to be there still: no system call then.
     Seen lookIfDue() ZOR_EXCLUDES(mutex_);
     /// The last look's; 0 before the first. One atomic read.

@@ -108,11 +108,21 @@ FileURL ZORGlobalConfiguration::transientDirectory() {
 }
 
 FileURL ZORGlobalConfiguration::stagingDirectory() {
+    return openStagingDirectory().url;
+}
+
+UsableDirectory ZORGlobalConfiguration::openStagingDirectory() {
     const RecursiveMutexLock held(lock_);
-    cachesDirectory();
     FileURL url = places_.stagingDirectory();
-    makeDirectory(url, plainDirectory, __func__, "staging dir");
-    return url;
+    auto opened = fileManager_.openOrCreateDirectoryAtURL(url, Intermediates::no, plainDirectory);
+    if (!opened && opened.error().isPosix(ENOENT)) {
+        cachesDirectory();
+        opened = fileManager_.openOrCreateDirectoryAtURL(url, Intermediates::yes, plainDirectory);
+    }
+    if (!opened)
+        log_.write(logLevelError, "stagingDirectory", "Failed to create %s at \"%s\": %s", "staging dir", url.c_str(),
+                   opened.error().text().c_str());
+    return {.url = std::move(url), .opened = std::move(opened)};
 }
 
 FileURL ZORGlobalConfiguration::deathrowDirectory() {

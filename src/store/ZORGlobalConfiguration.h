@@ -57,6 +57,8 @@ public:
     FileURL transientDirectory();
     FileURL transientBundleDirectory();
     FileURL stagingDirectory();
+    /// The same directory, open. One that is there costs no look at the directories above it.
+    UsableDirectory openStagingDirectory();
     FileURL deathrowDirectory();
     FileURL replaceDirectory();
     FileURL bundleDirectory();

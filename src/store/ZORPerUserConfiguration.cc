@@ -32,10 +32,10 @@ bool ZORPerUserConfiguration::existsUserBaseDirectory() {
 }
 
 std::optional<UsableDirectory> ZORPerUserConfiguration::openHome() {
-    const auto home = home_.look().directory;
+    auto [seen, opened] = home_.lookAndOpen();
+    const auto& home = seen.directory;
     if (!home)
         return std::nullopt;
-    auto opened = fileManager_.resolver().openDirectoryPath(*home);
     if (!opened)
         return judged(*home,
                       posixError(ZOR_HERE, opened.error(), "open of the home failed: %s", errorText(opened.error())),

@@ -26,13 +26,16 @@ protected:
 };
 
 // Goal: every class gets its place, tree, modes and owners, and a directory name that is not its internal UUID; a new
-// daemon finds the same container. Method: all classes, live and transient, judged by a reader of its own.
+// daemon finds the same container. Method: all classes, live and transient, these with a umask that takes what it can,
+// judged by a reader of its own.
 TEST_F(Create, EveryClassGetsItsTree) {
     for (const bool transient : {false, true})
         for (std::uint64_t number = 1; ipc::isContainerClass(number); ++number) {
             const auto containerClass = static_cast<ContainerClass>(number);
             SCOPED_TRACE(std::string(className(containerClass)) + (transient ? " transient" : ""));
+            const mode_t mask = ::umask(transient ? 077 : 022);
             const auto found = world.create("com.example", containerClass, transient);
+            ::umask(mask);
             ASSERT_TRUE(found) << found.error().text();
             EXPECT_FALSE(found->existed);
             EXPECT_EQ(found->record->transient(), transient);

@@ -2,8 +2,11 @@
 // A Disk before another one that brings all calls to one place, which may refuse them, make them or watch them.
 #pragma once
 
+#include "os/FileDescriptor.h"
 #include "platform/Disk.h"
 
+#include <cerrno>
+#include <fcntl.h>
 #include <functional>
 
 namespace zor::support {
@@ -85,6 +88,10 @@ public:
     }
     int changeOwner(int fd, uid_t uid, gid_t gid) override {
         return pass(DiskCall::changeOwner, "", fd, [&] { return inner_.changeOwner(fd, uid, gid); });
+    }
+    int changeOwnerOf(int at, const char* name, uid_t uid, gid_t gid) override {
+        const platform::FileDescriptor item(::openat(at, name, O_PATH | O_NOFOLLOW | O_CLOEXEC));
+        return item.valid() ? changeOwner(item.get(), uid, gid) : -errno;
     }
     int setTimes(int fd, const timespec& access, const timespec& modification) override {
         return pass(DiskCall::setTimes, "", fd, [&] { return inner_.setTimes(fd, access, modification); });
