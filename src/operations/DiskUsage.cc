@@ -23,19 +23,13 @@ std::optional<std::uint64_t> numberIn(const plist::Value& value) {
     return value.asUnsigned();
 }
 
-} // namespace
-
-std::optional<std::uint64_t> DiskUsage::keptDiskUsage(const ContainerAddress& address, const IdentifierLock& held) {
-    const auto value = needs_.infoValues.infoValueForKey(&staticDiskUsageKey, address, held);
-    if (value)
-        return numberIn(*value);
-    if (!value.error().is(ErrorCode::infoKeyNotFound))
-        needs_.log.write(
-            logLevelError, function, "Error looking up info value for userId: %u, identifier: %s, Class: %llu: %llu",
-            address.userId, ZOR_SHOWN(address.identifier), static_cast<unsigned long long>(address.containerClass),
-            static_cast<unsigned long long>(value.error().replyCode()));
-    return std::nullopt;
+/// The size that an earlier measurement left. Who asks holds the lock of the record's container.
+std::optional<std::uint64_t> keptDiskUsage(const ZORMetadata& record) {
+    const plist::Value* const value = record.info() ? record.info()->find(staticDiskUsageKey) : nullptr;
+    return value ? numberIn(*value) : std::nullopt;
 }
+
+} // namespace
 
 void DiskUsage::keepDiskUsage(const Caller& caller, const ContainerAddress& address, const FileURL& measured,
                               std::uint64_t bytes) {
@@ -63,7 +57,7 @@ Result<std::uint64_t> DiskUsage::diskUsage(const Caller& caller, const Container
         const auto record = TRY(knownContainer(needs_.log, needs_.cache, function, address, lock));
         isKept = isBundleClass(address.containerClass) && !record->transient();
         if (isKept)
-            if (const auto kept = keptDiskUsage(address, lock))
+            if (const auto kept = keptDiskUsage(*record))
                 return *kept;
         container = record->url();
         directory = needs_.fileManager.resolver().openDirectory(container);

@@ -48,8 +48,6 @@ public:
 
 private:
     Result<std::uint64_t> diskUsage(const Caller& caller, const ContainerAddress& address);
-    /// The size that an earlier measurement left.
-    std::optional<std::uint64_t> keptDiskUsage(const ContainerAddress& address, const IdentifierLock& held);
     void keepDiskUsage(const Caller& caller, const ContainerAddress& address, const FileURL& measured,
                        std::uint64_t bytes);
 
