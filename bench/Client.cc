@@ -19,7 +19,7 @@ using platform::FileDescriptor;
 
 namespace {
 
-constexpr std::size_t bufferBytes = std::size_t{64} * 1024; // more than any reply here
+constexpr std::size_t bufferBytes = std::size_t{64} * 1024; // more than nearly any reply here
 constexpr std::uint64_t requestId = 1;
 
 } // namespace
@@ -90,7 +90,7 @@ std::span<const std::uint8_t> Client::receive() {
         wanted = ipc::frameHeaderBytes +
                  ipc::decodeFrameHeader(std::span(buffer_).first<ipc::frameHeaderBytes>()).payloadBytes;
         if (wanted > buffer_.size())
-            throw Failure("a reply is too long");
+            buffer_.resize(wanted);
     }
     return std::span(buffer_).first(wanted);
 }

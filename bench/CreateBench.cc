@@ -104,7 +104,7 @@ Figure measureWithoutSyncs(const Settings& settings) {
     Creator creator(daemon, "com.example.create.");
     TreeFloor floor(place.path(), TreeFloor::Syncs::off);
     const Pairs pairs = compare(creator, floor, settings.rounds(25, 9), settings.rounds(50, 30));
-    Figure figure = ofPairs(pairs, "create.noSyncs", "create, no syncs, p50", 1.5);
+    Figure figure = ofPairs(pairs, "create.noSyncs", "create, no syncs, p50", 1.4);
     figure.remark = "on " + place.description() + "; one processor";
     return figure;
 }

@@ -74,7 +74,7 @@ std::vector<Figure> measureUsage(const Settings& settings, const Place& place, c
     }
     const int files = filled.tree.files();
     std::vector<Figure> figures = {figureOf(walk, "usage.warm", text("usage of %d files, warm", files), 1.1),
-                                   figureOf(du, "usage.du", text("usage of %d files, warm, against du", files), 1.0)};
+                                   figureOf(du, "usage.du", text("usage of %d files, warm, against du", files), 0.65)};
     Pairs cold;
     const std::uint64_t bytes = filled.tree.measure().bytes;
     for (int round = 0; round < settings.rounds(3, 1) && dropCaches(place.path()); ++round) {
@@ -132,7 +132,7 @@ std::vector<Figure> measureTree(const Settings& settings) {
         writeOut(place.path());
         peer = runProgram({"rm", "-rf", tree.path()});
     }
-    figures.push_back(figureOf(removal, "removal", text("death-row removal of %d files", files), 1.1,
+    figures.push_back(figureOf(removal, "removal", text("death-row removal of %d files", files), 0.7,
                                text("rm -rf takes %.0f ms; on ", peer * 1e3) + place.description()));
     return figures;
 }
