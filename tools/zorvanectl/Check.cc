@@ -139,6 +139,7 @@ int report(const Output& output, const std::vector<Finding>& findings) {
         output.json(document);
         return exitCodeFor(findings);
     }
+    output.page();
     for (const Finding& finding : findings)
         show(output, finding);
     output.line(countText(faultsIn(findings)));

@@ -405,6 +405,7 @@ void describeCommandLine(CLI::App& app, Arguments& arguments, Action& action) {
     addNumber(app, "--timeout", arguments.connect.timeoutMilliseconds,
               "Milliseconds to wait for an answer; 0 for ever");
     app.add_flag(jsonOption, arguments.json, "Results and errors as JSON");
+    app.add_flag("--no-pager", arguments.noPager, "Show long results on the terminal as they come");
     app.require_subcommand(1);
     app.fallthrough();
     addContainerCommands(app, arguments, action);

@@ -15,6 +15,7 @@ namespace zorvanectl {
 struct Arguments {
     zorvane::ConnectOptions connect;
     bool json = false;
+    bool noPager = false;
     std::string className;
     /// A number or a name.
     std::string user;

@@ -1,13 +1,12 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Output.h"
 
+#include "Screen.h"
 #include "plist/Value.h"
 
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
-#include <cstdlib>
-#include <cstring>
 #include <cwchar>
 #include <iterator>
 #include <unistd.h>
@@ -77,14 +76,6 @@ int exitCodeOf(const zorvane::Error& error) {
     return exitDaemonError;
 }
 
-/// Colours are for people's terminals, and only where they want them.
-bool isColoured(int descriptor) {
-    const char* unwanted = std::getenv("NO_COLOR");
-    const char* terminal = std::getenv("TERM");
-    return (!unwanted || *unwanted == '\0') && terminal && std::strcmp(terminal, "dumb") != 0 &&
-           ::isatty(descriptor) != 0;
-}
-
 constexpr const char* underlined = "\033[4m";
 constexpr const char* boldRed = "\033[1;31m";
 constexpr const char* plain = "\033[0m";
@@ -92,6 +83,27 @@ constexpr const char* plain = "\033[0m";
 std::string padded(const std::string& text, std::size_t columns) {
     const std::size_t taken = columnsOf(text);
     return text + std::string(columns > taken ? columns - taken : 0, ' ');
+}
+
+constexpr std::size_t gap = 2;
+constexpr std::size_t indent = 4;
+
+/// The cells of a row, on as many lines as the terminal's width makes of them; without a terminal, on one.
+std::string rowOf(const std::vector<std::string>& cells, const std::vector<std::size_t>& widths, std::size_t columns) {
+    std::string text;
+    std::size_t taken = 0;
+    for (std::size_t column = 0; column < cells.size(); ++column) {
+        const bool isLast = column + 1 == cells.size();
+        const std::size_t width = std::max(widths[column], columnsOf(cells[column]));
+        if (columns != 0 && taken > indent && taken + (isLast ? columnsOf(cells[column]) : width) > columns) {
+            text.erase(text.find_last_not_of(' ') + 1);
+            text += "\n" + std::string(indent, ' ');
+            taken = indent;
+        }
+        text += isLast ? cells[column] : padded(cells[column], width + gap);
+        taken += width + gap;
+    }
+    return text;
 }
 
 std::string shown(const zorvane::Value& value) {
@@ -128,26 +140,34 @@ void Output::line(const std::string& text) const {
     std::printf("%s\n", text.c_str());
 }
 
+void Output::page() const {
+    if (!isJson())
+        Screen::ofOutput().page();
+}
+
 void Output::remark(const std::string& text) const {
     std::fprintf(stderr, "zorvanectl: %s\n", printable(text).c_str());
 }
 
 void Output::table(const std::vector<std::string>& header, const std::vector<std::vector<std::string>>& rows) const {
+    page();
+    const Screen& screen = Screen::ofOutput();
+    // A cell that is wider than its column is to be moves the rest of its own row alone.
+    const std::size_t wide = screen.columns() == 0 ? SIZE_MAX : screen.columns() / 3;
     std::vector<std::size_t> widths;
     for (std::size_t column = 0; column < header.size(); ++column) {
-        widths.push_back(columnsOf(header[column]));
-        for (const auto& row : rows)
-            widths.back() = std::max(widths.back(), columnsOf(row[column]));
+        std::size_t narrowest = SIZE_MAX;
+        std::size_t widest = 0;
+        for (const auto& row : rows) {
+            narrowest = std::min(narrowest, columnsOf(row[column]));
+            widest = std::max(widest, columnsOf(row[column]));
+        }
+        widths.push_back(std::max({columnsOf(header[column]), std::min(narrowest, widest), std::min(widest, wide)}));
     }
-    const auto textOf = [&](const std::vector<std::string>& row) {
-        std::string text;
-        for (std::size_t column = 0; column + 1 < row.size(); ++column)
-            text += padded(row[column], widths[column]) + "  ";
-        return text + row.back();
-    };
-    line(isColoured(STDOUT_FILENO) ? underlined + textOf(header) + plain : textOf(header));
+    const std::string names = rowOf(header, widths, screen.columns());
+    line(screen.isColoured() ? underlined + names + plain : names);
     for (const auto& row : rows)
-        line(textOf(row));
+        line(rowOf(row, widths, screen.columns()));
 }
 
 void Output::tree(const std::string& name, const zorvane::Value& value, const std::string& indent) const {
@@ -207,8 +227,12 @@ int Output::localError(int exitCode, const std::string& message, const std::stri
 int Output::finished(int exitCode) const {
     errno = 0;
     const bool written = std::fflush(stdout) == 0 && std::ferror(stdout) == 0;
-    if (written)
+    const bool wasPaged = Screen::ofOutput().isPaged();
+    const int error = errno;
+    Screen::ofOutput().end();
+    if (written || wasPaged)
         return exitCode;
+    errno = error;
     const char* reason = errno == 0 ? nullptr : ::strerrordesc_np(errno);
     return localError(
         exitOutputLost,

@@ -44,11 +44,14 @@ public:
     [[nodiscard]] bool isJson() const { return format_ == Format::json; }
     /// An object; its version is added.
     void json(nlohmann::json document) const;
+    /// Before what may be longer than the terminal: for people, a pager shows it. table() does so itself.
+    void page() const;
     /// One line to standard output.
     void line(const std::string& text) const;
     /// One line to standard error, beside a result.
     void remark(const std::string& text) const;
-    /// Columns as wide as their widest cell, the header first; nothing but the header when there are no rows.
+    /// Columns as wide as their widest cell, the header first; nothing but the header when there are no rows. A row
+    /// that is wider than the terminal goes on in another, indented line.
     void table(const std::vector<std::string>& header, const std::vector<std::vector<std::string>>& rows) const;
     /// A name and what is under it, a line each, deeper ones indented.
     void tree(const std::string& name, const zorvane::Value& value, const std::string& indent = "") const;

@@ -117,6 +117,7 @@ int registryList(const zorvane::ConnectOptions& connect, const Output& output) {
         output.json(std::move(document));
         return isWhole(report) ? exitDone : exitFindings;
     }
+    output.page();
     if (report.problem)
         output.line(printable(directory) + " " + printable(*report.problem));
     for (const RegistryFileReport& file : report.files)

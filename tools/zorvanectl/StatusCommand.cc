@@ -158,6 +158,7 @@ int status(const zorvane::ConnectOptions& connect, const Output& output) {
         output.json(std::move(document));
         return exitDone;
     }
+    output.page();
     showHead(output, connect.root, status, around);
     if (const auto* map = std::get_if<zorvane::Map>(&answer->content))
         for (const char* key : {statusPeer, statusCounters}) // 'entitlements show' and 'why' have the others

@@ -4,6 +4,7 @@
 #include "CommandLine.h"
 #include "CommandWalk.h"
 #include "Completion.h"
+#include "Screen.h"
 #include "os/FileDescriptor.h"
 
 #include <algorithm>
@@ -46,6 +47,8 @@ int run(int argumentCount, char** argumentValues, const std::vector<std::string>
             return app.exit(error);
         return sayMistake(app, error, words);
     }
+    if (arguments.noPager)
+        Screen::ofOutput().leavePlain();
     return action ? action(Output(arguments.json ? Format::json : Format::people)) : exitUsage;
 }
 
