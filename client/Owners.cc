@@ -31,7 +31,7 @@ std::string textBelow(std::string path) {
 } // namespace
 
 ContainerOwners containerOwners(const std::string& root) {
-    const auto noAccount = [](auto) { return std::unexpected(ENOENT); };
+    const auto noAccount = [](auto) { return zor::Errno(ENOENT); };
     const auto read = ipc::readUserNumbers(textBelow(root), {.named = noAccount, .numbered = noAccount});
     const ipc::UserNumbers numbers = read ? read->numbers : ipc::UserNumbers();
     return {.installer = numbers.installer, .system = numbers.system, .first = numbers.first, .last = numbers.last};

@@ -73,12 +73,12 @@ OpenResult openDeathRow(int top) {
 
 OpenResult openOrMakeDeathRow(platform::Disk& disk, int top) {
     if (const int failed = makeIfMissing(disk, top, deathRowOuter))
-        return std::unexpected(failed);
+        return Errno(failed);
     const OpenResult outer = openClosed(top, deathRowOuter);
     if (!outer)
         return outer.error();
     if (const int failed = makeIfMissing(disk, outer->get(), deathRowInner))
-        return std::unexpected(failed);
+        return Errno(failed);
     return openClosed(outer->get(), deathRowInner);
 }
 

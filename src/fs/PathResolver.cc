@@ -142,7 +142,7 @@ OpenResult makeDirectories(platform::Disk& disk, int base, std::string_view rela
         if (!below && below.error() == ENOENT) {
             const int made = disk.makeDirectory(current->get(), component.c_str(), mode);
             if (made < 0 && made != -EEXIST)
-                return std::unexpected(-made);
+                return Errno(-made);
             below = openBelow(current->get(), component.c_str(), flags, mounts);
         }
         current = std::move(below);

@@ -51,7 +51,7 @@ Result<std::uint64_t> DiskUsage::diskUsage(const Caller& caller, const Container
     TRY(checkAddress(needs_.log, function, address));
     bool isKept = false;
     FileURL container;
-    fs::OpenResult directory = std::unexpected(ENOENT);
+    fs::OpenResult directory = Errno(ENOENT);
     {
         const IdentifierWriteLock lock(needs_.locks, address.lockName());
         const auto record = TRY(knownContainer(needs_.log, needs_.cache, function, address, lock));
@@ -65,7 +65,7 @@ Result<std::uint64_t> DiskUsage::diskUsage(const Caller& caller, const Container
         if (directory && !needs_.fileManager.judgeOwner(
                              directory->get(), container,
                              ZORGlobalConfiguration::ownerOfClassDirectory(address.containerClass, address.userId)))
-            directory = std::unexpected(EPERM);
+            directory = Errno(EPERM);
     }
     const auto begin = std::chrono::system_clock::now();
     const fs::Usage usage = [&] {

@@ -42,7 +42,7 @@ TEST(UserNumbers, ReadsNamesAndNumbers) {
         ASSERT_TRUE(users) << row.text << users.error();
         EXPECT_EQ(users->numbers, row.numbers) << row.text;
         EXPECT_EQ(users->doubts.size(), row.doubts) << row.text;
-        const auto noAccount = [](auto) { return std::unexpected(ENOENT); };
+        const auto noAccount = [](auto) { return Errno(ENOENT); };
         const auto again = readUserNumbers(textOf(row.numbers), {.named = noAccount, .numbered = noAccount});
         EXPECT_TRUE(again && again->numbers == row.numbers) << row.text;
     }
