@@ -126,15 +126,23 @@ MountFence::Answered MountFence::Judgement::ask() {
 bool MountFence::answers(Asked asked) {
     if (kind_ != Kind::home)
         return true;
+    bool isJudged = false;
     {
         const MutexLock held(judgement_->mutex);
         const auto age = std::chrono::steady_clock::now() - judgement_->answeredAt;
         if (judgement_->kind == MountKind::local || judgement_->kind == MountKind::usersOwn ||
             (asked == Asked::lately && age < homeAnswerHolds))
             return true;
+        isJudged = judgement_->kind != MountKind::unknown;
         // The question may outlive this object, and whoever made it.
         if (!judgement_->ownRoot.valid())
             judgement_->ownRoot.reset(::fcntl(judgement_->root, F_DUPFD_CLOEXEC, 0));
+    }
+    // A home that the kernel remembers is judged without a question to anybody; most are of this machine.
+    if (!isJudged) {
+        const auto home = platform::openBeneathRemembered(judgement_->root, judgement_->path.c_str(), pathFlags);
+        if (home && judgement_->judge(home->get()) == MountKind::local)
+            return true;
     }
     if (question_.ask([judgement = judgement_] { return judgement->ask(); }, homePatience))
         return true;

@@ -10,6 +10,7 @@
 #include "base/BlockingScope.h"
 #include "base/Mutex.h"
 
+#include <algorithm>
 #include <chrono>
 #include <cstdint>
 #include <functional>
@@ -20,20 +21,27 @@
 
 namespace zor::platform {
 
+/// How much longer than the patience for the question a thread may take to begin with it: a machine that is so busy
+/// that a thread does not run says nothing of a file system.
+inline constexpr int beginFactor = 5;
+
 /// All questions of an object are the same one, so that one's answer is as good as another's.
 template <typename Answer>
 class BoundedQuestion {
 public:
     /// Runs `question` on another thread, or waits for the one that is under way unless somebody has already waited in
-    /// vain. None: it has not come back within `patience`, or there was no thread or no memory for it. Any thread.
+    /// vain. None: it has not come back within `patience` from its beginning, or there was no thread or no memory for
+    /// it. Any thread.
     std::optional<Answer> ask(std::function<Answer()> question, std::chrono::milliseconds patience) {
         const BlockingScope blocking;
         const MutexLock held(state_->mutex);
         if (state_->late || (!state_->underWay && !begin(std::move(question))))
             return std::nullopt;
         const std::uint64_t answersBefore = state_->answers;
-        const auto until = std::chrono::steady_clock::now() + patience;
+        const auto asked = std::chrono::steady_clock::now();
         while (state_->answers == answersBefore) {
+            const auto until =
+                state_->begun ? std::max(asked, state_->begunAt) + patience : asked + patience * beginFactor;
             const auto left = until - std::chrono::steady_clock::now();
             if (left <= left.zero()) {
                 state_->late = true;
@@ -50,6 +58,9 @@ private:
         Mutex mutex;
         ConditionVariable ended;
         bool underWay ZOR_GUARDED_BY(mutex) = false;
+        /// Whether the one under way has its thread, and since when.
+        bool begun ZOR_GUARDED_BY(mutex) = false;
+        std::chrono::steady_clock::time_point begunAt ZOR_GUARDED_BY(mutex);
         /// Somebody gave up waiting for the question that is under way.
         bool late ZOR_GUARDED_BY(mutex) = false;
         std::uint64_t answers ZOR_GUARDED_BY(mutex) = 0;
@@ -59,6 +70,12 @@ private:
     bool begin(std::function<Answer()> question) ZOR_REQUIRES(state_->mutex) {
         try {
             std::thread([state = state_, question = std::move(question)]() mutable {
+                {
+                    const MutexLock held(state->mutex);
+                    state->begun = true;
+                    state->begunAt = std::chrono::steady_clock::now();
+                    state->ended.broadcast(); // who waits has another end of its patience
+                }
                 std::optional<Answer> answer;
                 try {
                     answer.emplace(question());
@@ -69,7 +86,7 @@ private:
                 const MutexLock held(state->mutex);
                 state->answer = std::move(answer);
                 ++state->answers;
-                state->underWay = state->late = false;
+                state->underWay = state->late = state->begun = false;
                 state->ended.broadcast();
             }).detach();
             state_->underWay = true;

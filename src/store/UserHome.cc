@@ -1,14 +1,20 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/UserHome.h"
 
+#include "base/Format.h"
 #include "base/ZORError.h"
+#include "fs/ItemStatus.h"
 #include "os/CoarseClock.h"
+#include "os/Openat2.h"
 
 #include <cerrno>
 #include <climits>
 #include <cstdlib>
+#include <fcntl.h>
 #include <memory>
+#include <optional>
 #include <string>
+#include <unistd.h>
 
 namespace zor {
 
@@ -20,7 +26,23 @@ namespace {
 /// How long a home that was there is taken to be there still by who only reads what is cached.
 constexpr std::int64_t lookEveryMilliseconds = 1000;
 
+/// The path without links of a home that the kernel remembers and that lies on a disk of this machine: nobody is asked,
+/// so a busy machine takes none for dead.
+std::optional<FileURL> rememberedPath(const std::string& home) {
+    const auto opened = platform::openRemembered(home.c_str());
+    if (!opened || fs::kindOfMount(fs::mountNumber(opened->get())) != fs::MountKind::local)
+        return std::nullopt;
+    char path[PATH_MAX];
+    const ssize_t bytes =
+        ::readlinkat(AT_FDCWD, formatted("/proc/self/fd/%d", opened->get()).c_str(), path, sizeof path);
+    if (bytes <= 0 || static_cast<std::size_t>(bytes) == sizeof path || path[0] != '/')
+        return std::nullopt;
+    return FileURL::directory(std::string(path, static_cast<std::size_t>(bytes)));
+}
+
 ErrnoOr<FileURL> resolved(const platform::PasswordEntry& entry, HomeQuestion& question) {
+    if (auto path = rememberedPath(entry.homeDirectory))
+        return std::move(*path);
     // A home may be reached through links that its administrator made; below it, none is followed.
     const auto path = question.ask(
         [home = entry.homeDirectory]() -> ErrnoOr<std::string> {
