@@ -92,6 +92,8 @@ private:
     std::uint64_t entries_ = 0;
     /// Why the root has to be looked at once more, or 0.
     int rootChanged_ = 0;
+    /// The root is not what is to be removed.
+    bool anotherMet_ = false;
     /// Directories of the current path up to this depth hold something that could not be removed; -1: none does.
     long doomedDepth_ = -1;
 };
@@ -105,6 +107,8 @@ int Remover::remove(int directory, const char* name) {
         rootChanged_ = 0;
         doomedDepth_ = -1;
         const int result = walker.walk(directory, name, visitor);
+        if (anotherMet_)
+            return -ESTALE;
         if (result == -ENOENT && pass > 1)
             return 0;
         if (result < 0 || rootChanged_ == 0)
@@ -125,6 +129,10 @@ WalkStep Remover::visit(const WalkEntry& entry) {
         emptyTogether(disk_, parent_, name_);
     switch (entry.kind) {
     case WalkEntryKind::directory:
+        anotherMet_ =
+            entry.depth == 0 && entry.directory >= 0 && callbacks_.isMeant && !callbacks_.isMeant(entry.directory);
+        if (anotherMet_)
+            return WalkStep::stop;
         // The doomed names of this depth belong to a directory before this one.
         doomedDepth_ = std::min(doomedDepth_, static_cast<long>(entry.depth) - 1);
         return WalkStep::proceed;

@@ -33,6 +33,9 @@ struct RemoveCallbacks {
     /// Told, with its path as above, of each directory below the root whose immutable or append-only flag was in the
     /// way and was cleared. Optional.
     std::function<void(const std::string& path)> directoryMadeMutable;
+    /// Asked with the root's open directory, before anything in it is touched; with the answer false nothing is, and
+    /// the removal ends with -ESTALE. Optional.
+    std::function<bool(int directory)> isMeant;
     /// Asked before each item; with the answer false the removal ends with -ECANCELED. Optional.
     std::function<bool()> goOn;
 };

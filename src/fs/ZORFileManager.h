@@ -93,8 +93,10 @@ public:
     /// Removes a tree; what is missing is not missed. An item that cannot be removed lets the rest go and is the error.
     /// An immutable or append-only item is made mutable and removed. Absent URL: EFAULT.
     Result<void> removeItemAtURL(const std::optional<FileURL>& url);
-    /// The same of an item in a directory that is open; `url` is its name there, and in messages.
-    Result<void> removeItemIn(int directory, const FileURL& url);
+    /// The same of an item in a directory that is open; `url` is its name there, and in messages. A directory of which
+    /// `isMeant` says no stays, with everything in it: ESTALE.
+    Result<void> removeItemIn(int directory, const FileURL& url,
+                              const std::function<bool(int directory)>& isMeant = nullptr);
     Result<void> copyItemAtURL(const FileURL& source, const FileURL& destination);
     Result<void> copyItemIfExistsAtURL(const FileURL& source, const FileURL& destination);
     Result<void> moveItemAtURL(const FileURL& source, const FileURL& destination, const GoOn& goOn = {});

@@ -58,10 +58,12 @@ Result<void> ZORFileManager::removeItemAtURL(const std::optional<FileURL>& url) 
     return removeItemIn(parent->directory.get(), *url);
 }
 
-Result<void> ZORFileManager::removeItemIn(int directory, const FileURL& url) {
+Result<void> ZORFileManager::removeItemIn(int directory, const FileURL& url,
+                                          const std::function<bool(int directory)>& isMeant) {
     int firstError = 0;
     static constexpr const char* function = "removeItemAtURL";
     fs::RemoveCallbacks callbacks;
+    callbacks.isMeant = isMeant;
     callbacks.directoryMadeMutable = [&](const std::string& path) {
         log_.write(logLevelNotice, function, "Unset UF_IMMUTABLE on %s", ZOR_SHOWN(below(url, path)));
     };

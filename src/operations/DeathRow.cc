@@ -3,6 +3,7 @@
 
 #include "fs/AtomicFile.h"
 #include "fs/FileSystemDeathRow.h"
+#include "fs/Names.h"
 #include "os/Openat2.h"
 
 #include <cerrno>
@@ -24,6 +25,15 @@ bool isMissing(int directory, const FileURL& url) {
     return !item && item.error() == ENOENT;
 }
 
+/// Whether an item that could not be moved for that reason may be hidden beside itself. Its name on death row may be
+/// free under another; what is missing, or another's, is not to be moved at all; and what an own shortage stops, it
+/// would stop again.
+bool canBeHidden(const ZORError& error) {
+    const bool isNameTaken = error.isPosix(ENOTEMPTY) || error.isPosix(EEXIST);
+    return !isNameTaken && !error.isPosix(ENOENT) && !error.isPosix(DeathRow::notTheContainer) &&
+           !error.isOwnShortage();
+}
+
 /// A directory of another user's. Anything else in a container's place its owner may remove anyway. Without root's
 /// power all is the daemon's.
 bool isAnothers(const struct stat& status, std::uint32_t owner) {
@@ -31,6 +41,11 @@ bool isAnothers(const struct stat& status, std::uint32_t owner) {
 }
 
 } // namespace
+
+bool DeathRow::isOf(int directory, std::uint32_t owner) {
+    struct stat status{};
+    return ::fstat(directory, &status) == 0 && !isAnothers(status, owner);
+}
 
 Result<void> DeathRow::_moveItemAtURLToDeathRow(const FileURL& url, StartDeletionThread startDeletionThread,
                                                 std::optional<std::uint32_t> owner) {
@@ -51,10 +66,10 @@ Result<void> DeathRow::_moveItemAtURLToDeathRow(const FileURL& url, StartDeletio
         if (!unique)
             return makeError(needs_.log, {moveFunction, __LINE__}, ErrorCode::moveToDeathRowFailed, &moved.error(),
                              LogFlag::yes, "Failed to create unique directory at: %s", url.c_str());
-        if (moved && *moved == Row::ofFileSystem)
+        if (moved && *moved != Row::ofRoot)
             (void)fileManager.removeItemAtURL(unique);
         if (moved) {
-            if (startDeletionThread == StartDeletionThread::yes)
+            if (startDeletionThread == StartDeletionThread::yes || *moved == Row::besideItself)
                 deleteContainersOnDeathRowWithCompletion(nullptr);
             return {};
         }
@@ -73,8 +88,13 @@ Result<void> DeathRow::_moveItemAtURLToDeathRow(const FileURL& url, StartDeletio
 
 Result<DeathRow::Row> DeathRow::condemn(const FileURL& url, const FileURL& destination,
                                         std::optional<std::uint32_t> owner) {
-    const platform::MutexLock moving(moving_);
-    return condemn(url, destination, owner, moving);
+    auto moved = [&] {
+        const platform::MutexLock moving(moving_);
+        return condemn(url, destination, owner, moving);
+    }();
+    if (moved && *moved == Row::besideItself)
+        deleteContainersOnDeathRowWithCompletion(nullptr); // nobody else asks for it
+    return moved;
 }
 
 Result<DeathRow::Row> DeathRow::condemn(const FileURL& url, const FileURL& destination,
@@ -89,14 +109,37 @@ Result<DeathRow::Row> DeathRow::condemn(const FileURL& url, const FileURL& desti
     if (owner)
         TRY(judgeOwner(from->directory.get(), url, *owner));
     const auto renamed = needs_.fileManager.renameItem(from->directory.get(), url, to->directory.get(), destination);
-    if (!renamed && renamed.error().isPosix(EXDEV)) {
-        TRY(condemnOnItsFileSystem(from->directory.get(), url, owner));
-        return Row::ofFileSystem;
+    if (renamed) {
+        if (owner)
+            TRY(putBackIfAnothers(from->directory.get(), url, to->directory.get(), destination, *owner));
+        return Row::ofRoot;
     }
-    TRY(renamed);
+    const auto onItsFileSystem = renamed.error().isPosix(EXDEV)
+                                     ? condemnOnItsFileSystem(from->directory.get(), url, owner)
+                                     : Result<void>(renamed);
+    if (onItsFileSystem)
+        return Row::ofFileSystem;
+    if (!canBeHidden(onItsFileSystem.error()))
+        return onItsFileSystem.error();
+    TRY(hideBesideItself(from->directory.get(), url, owner));
+    return Row::besideItself;
+}
+
+Result<void> DeathRow::hideBesideItself(int from, const FileURL& url, std::optional<std::uint32_t> owner) {
+    // Its name is one that boots know, and that no listing shows.
+    const FileURL hidden = url.deletingLastPathComponent().appendingDirectory(fs::uniqueName(fs::copyPrefix));
+    const int renamed = needs_.fileManager.disk().rename(from, std::string(url.lastPathComponent()).c_str(), from,
+                                                         std::string(hidden.lastPathComponent()).c_str(), 0);
+    if (renamed < 0)
+        return posixError({moveFunction, __LINE__}, -renamed, "rename of %s to %s failed: %s", url.c_str(),
+                          hidden.c_str(), errorText(-renamed));
     if (owner)
-        TRY(putBackIfAnothers(from->directory.get(), url, to->directory.get(), destination, *owner));
-    return Row::ofRoot;
+        TRY(putBackIfAnothers(from, url, from, hidden, *owner));
+    {
+        const platform::MutexLock held(hiddenMutex_);
+        hidden_.push_back({.url = hidden, .owner = owner});
+    }
+    return {};
 }
 
 Result<void> DeathRow::condemnOnItsFileSystem(int from, const FileURL& url, std::optional<std::uint32_t> owner) {

@@ -11,6 +11,10 @@
 // before the move whose the directory is, and again when it has come to death row, where nobody can change it any more:
 // another's goes back. A pass waits for that: it takes no item while one is being moved.
 //
+// An item for which no death row can be had, since its name on that file system is taken or nothing can be made there,
+// is hidden beside itself in one rename, under a name that nobody can guess. A pass removes it from there, and asks the
+// directory that it has opened whose it is. After a stop the next boot finds it by its name (OrphanCleanUp).
+//
 // Any thread; takes no identifier lock.
 #pragma once
 
@@ -58,9 +62,10 @@ public:
     Result<void> _moveItemAtURLToDeathRow(const FileURL& url, StartDeletionThread startDeletionThread,
                                           std::optional<std::uint32_t> owner = std::nullopt);
 
-    enum class Row : std::uint8_t { ofRoot, ofFileSystem };
-    /// Moves an item to `destination` on root's death row, or where that is another file system to the row of its own.
-    /// Errors are of the system, or notTheContainer, and not logged.
+    enum class Row : std::uint8_t { ofRoot, ofFileSystem, besideItself };
+    /// Moves an item to `destination` on root's death row, where that is another file system to the row of its own, and
+    /// where neither can be out of sight beside itself, with a pass queued. Errors are of the system, or
+    /// notTheContainer, and not logged.
     Result<Row> condemn(const FileURL& url, const FileURL& destination, std::optional<std::uint32_t> owner);
 
     /// Queues one deletion pass; the completion runs on the death-row queue with success or the pass's last error code.
@@ -93,6 +98,10 @@ private:
                         const platform::MutexLock& moving);
     /// `from` is open and holds the item.
     Result<void> condemnOnItsFileSystem(int from, const FileURL& url, std::optional<std::uint32_t> owner);
+    /// The same; for who cannot move it anywhere else.
+    Result<void> hideBesideItself(int from, const FileURL& url, std::optional<std::uint32_t> owner);
+    /// Whether an open directory may be what `owner` gave away.
+    [[nodiscard]] static bool isOf(int directory, std::uint32_t owner);
     /// Error notTheContainer for a directory of another's.
     Result<void> judgeOwner(int directory, const FileURL& url, std::uint32_t owner);
     /// The same of `destination` in `to`, with the item again where it was, or beside that.
@@ -102,6 +111,7 @@ private:
     struct Pass;
     void runDeletionPass(const std::function<void(ErrorCode)>& completion);
     void deleteEverythingOnDeathRow(Pass& pass);
+    void deleteEverythingHidden(Pass& pass);
     /// The row of the file system that `place` lies on.
     void deleteEverythingOnDeathRowOf(const FileURL& place, Pass& pass);
     /// Each item of an open row to `remove`; the error says that not all could be read.
@@ -120,6 +130,12 @@ private:
     /// Names in the directory for temporary files that passes closed and moved there; absent until a pass has looked
     /// for those of earlier daemons. On the death-row queue alone.
     std::optional<std::set<std::string>> inTemporary_;
+    struct Hidden {
+        FileURL url;
+        std::optional<std::uint32_t> owner;
+    };
+    platform::Mutex hiddenMutex_;
+    std::vector<Hidden> hidden_ ZOR_GUARDED_BY(hiddenMutex_);
     mutable platform::Mutex leftMutex_;
     Left left_ ZOR_GUARDED_BY(leftMutex_);
 };

@@ -82,6 +82,7 @@ void DeathRow::runDeletionPass(const std::function<void(ErrorCode)>& completion)
     const auto passed = needs_.boundary.run({passFunction, __LINE__}, [&]() -> Result<void> {
         Pass pass;
         deleteWhatIsInTemporary();
+        deleteEverythingHidden(pass);
         deleteEverythingOnDeathRow(pass);
         for (const FileURL& place : needs_.configuration.placesOfContainers())
             deleteEverythingOnDeathRowOf(place, pass);
@@ -144,6 +145,31 @@ void DeathRow::deleteEverythingOnDeathRow(Pass& pass) {
                     : makeError(needs_.log, {passFunction, __LINE__}, ErrorCode::listForDeletionFailed,
                                 &emptied.error(), LogFlag::yes, "Failed to get items for deletion: %s : %s",
                                 deathRow.c_str(), emptied.error().text().c_str());
+}
+
+void DeathRow::deleteEverythingHidden(Pass& pass) {
+    std::vector<Hidden> hidden;
+    {
+        const platform::MutexLock held(hiddenMutex_);
+        hidden.swap(hidden_);
+    }
+    for (Hidden& one : hidden) {
+        const auto parent = needs_.fileManager.resolver().openParent(one.url);
+        if (!parent)
+            continue; // the next boot finds it
+        // Its owner may have put another's directory in its place since it was judged.
+        const auto removed = needs_.fileManager.removeItemIn(
+            parent->directory.get(), one.url, [&](int directory) { return !one.owner || isOf(directory, *one.owner); });
+        if (removed)
+            continue;
+        pass.left.add(one.url.path());
+        pass.last = makeError(needs_.log, {passFunction, __LINE__}, ErrorCode::deathRowItemNotDestroyed,
+                              &removed.error(), LogFlag::yes, "Failed to destroy item at: %s", one.url.c_str());
+        if (removed.error().isPosix(ESTALE))
+            continue;
+        const platform::MutexLock held(hiddenMutex_);
+        hidden_.push_back(std::move(one));
+    }
 }
 
 void DeathRow::deleteEverythingOnDeathRowOf(const FileURL& place, Pass& pass) {

@@ -3,6 +3,7 @@
 
 #include "fs/Names.h"
 #include "fs/SharedWork.h"
+#include "store/ContainerLayout.h"
 #include "store/Names.h"
 
 #include <array>
@@ -56,6 +57,7 @@ std::uint64_t OrphanCleanUp::_cleanupOrphanedDataForUser(std::uint32_t userId, C
     // The content of another's directory there is no orphan; the getter has said so.
     if (!directory || !directory->opened)
         return 0;
+    const auto owner = topLevelOwnerOf(containerClass, userId);
     std::uint64_t removed = 0;
     std::vector<FileURL> batch;
     std::vector<FileURL> leftovers;
@@ -63,7 +65,7 @@ std::uint64_t OrphanCleanUp::_cleanupOrphanedDataForUser(std::uint32_t userId, C
         directory->url, ZORFileManager::Leftovers::shown, [&](int, const FileURL& entry) {
             (fs::isCopyLeftover(entry.lastPathComponent()) ? leftovers : batch).push_back(entry);
             if (batch.size() == orphanBatchMax)
-                removed += removeOrphans(directory->opened->get(), std::exchange(batch, {}), containerClass);
+                removed += removeOrphans(directory->opened->get(), std::exchange(batch, {}), containerClass, owner);
             return needs_.report.goOn();
         });
     if (!listed && !listed.error().isPosix(ENOENT))
@@ -71,13 +73,13 @@ std::uint64_t OrphanCleanUp::_cleanupOrphanedDataForUser(std::uint32_t userId, C
                          listed.error().text().c_str());
     if (!listed || needs_.report.stopped())
         return removed;
-    removed += removeOrphans(directory->opened->get(), batch, containerClass);
-    discard(leftovers);
+    removed += removeOrphans(directory->opened->get(), batch, containerClass, owner);
+    discard(leftovers, owner);
     return removed;
 }
 
 std::uint64_t OrphanCleanUp::removeOrphans(int classDirectory, const std::vector<FileURL>& entries,
-                                           ContainerClass containerClass) {
+                                           ContainerClass containerClass, std::optional<std::uint32_t> owner) {
     std::vector<Orphan> kinds(entries.size());
     fs::forEachStretch(kinds.size(), [&](std::size_t begin, std::size_t end) {
         for (std::size_t i = begin; i < end; ++i)
@@ -94,18 +96,18 @@ std::uint64_t OrphanCleanUp::removeOrphans(int classDirectory, const std::vector
         if (needs_.internalBuild.isInternalBuild())
             reportOrphan(entry);
         // A failure has been logged where it happened; the next boot tries again.
-        removed += needs_.deathRow._moveItemAtURLToDeathRow(entry, StartDeletionThread::no) ? 1 : 0;
+        removed += needs_.deathRow._moveItemAtURLToDeathRow(entry, StartDeletionThread::no, owner) ? 1 : 0;
     }
     return removed;
 }
 
 void OrphanCleanUp::discardCopyLeftovers(const FileURL& directory) {
-    discard(needs_.fileManager.copyLeftoversInDirectoryAtURL(directory));
+    discard(needs_.fileManager.copyLeftoversInDirectoryAtURL(directory), std::nullopt);
 }
 
-void OrphanCleanUp::discard(const std::vector<FileURL>& leftovers) {
+void OrphanCleanUp::discard(const std::vector<FileURL>& leftovers, std::optional<std::uint32_t> owner) {
     for (const FileURL& leftover : leftovers)
-        (void)needs_.deathRow._moveItemAtURLToDeathRow(leftover, StartDeletionThread::no);
+        (void)needs_.deathRow._moveItemAtURLToDeathRow(leftover, StartDeletionThread::no, owner);
 }
 
 } // namespace zor

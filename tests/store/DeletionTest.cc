@@ -118,7 +118,7 @@ TEST_F(Deletion, WhatGoesWithEachClass) {
 enum class Swap { link, file, fifo, aboveIsLink };
 
 // Goal: whatever an owner swaps in just before a step of a deletion, nothing outside is touched.
-// Method: a swap before the move, or before the first removal in place; outside lies a look-alike.
+// Method: a swap before the move, or before the first removal where it was hidden; outside lies a look-alike.
 TEST_F(Deletion, OwnersWhoSwapContainers) {
     for (const Swap swap : {Swap::link, Swap::file, Swap::fifo, Swap::aboveIsLink})
         for (const bool inPlace : {false, true}) {
@@ -126,11 +126,14 @@ TEST_F(Deletion, OwnersWhoSwapContainers) {
             const FoundContainer container = world.make("victim");
             const std::string outside = "outside/" + nameOf(container.path);
             const bool swapsAbove = swap == Swap::aboveIsLink;
-            const std::string place = swapsAbove ? parentOf(container.path) : container.path;
+            std::string place = swapsAbove ? parentOf(container.path) : container.path;
             world.write(outside + "/precious", "kept");
             bool swapped = false;
             world.disk().arm({.error = EACCES, .filter = [&](const DiskCallInfo& call) {
-                                  const bool isMove = isMoveOf(container, call);
+                                  const bool isHiding = call.subject.starts_with(nameOf(container.path) + " -> .");
+                                  const bool isMove = isMoveOf(container, call) && !isHiding;
+                                  if (isHiding && !swapsAbove)
+                                      place = parentOf(place) + "/" + call.subject.substr(call.subject.find("-> ") + 3);
                                   const bool isRemoval =
                                       call.call == DiskCall::unlinkFile || call.call == DiskCall::removeDirectory;
                                   if (!swapped && (inPlace ? isRemoval : isMove)) {
@@ -145,13 +148,14 @@ TEST_F(Deletion, OwnersWhoSwapContainers) {
                                   return isMove && inPlace;
                               }});
             (void)world.stage(container);
+            world.drainDeathRow();
             world.disk().disarm();
             EXPECT_TRUE(swapped);
             // Moved is gone, whatever lies there now.
             const std::string victim = "victim";
             const auto known = world.services().cache().containerForUser(mobile, application, &victim, false);
-            EXPECT_TRUE(inPlace || codeOf(known) == ErrorCode::notFound);
-            EXPECT_EQ(world.pass(), ErrorCode::success);
+            EXPECT_EQ(codeOf(known), ErrorCode::notFound);
+            (void)world.pass();
             EXPECT_EQ(world.read(outside + "/precious"), "kept");
             // As it was.
             for (const std::string& left : {place, world.path("aside")})
@@ -257,6 +261,11 @@ TEST_F(DeathRow, WantOfMemoryKeepsOneItem) {
     EXPECT_EQ(world.pass(), ErrorCode::success);
 }
 
+/// In a container's class directory, with what is hidden.
+std::ptrdiff_t entriesBeside(const FoundContainer& container) {
+    return std::distance(std::filesystem::directory_iterator(parentOf(container.path)), {});
+}
+
 const std::string rowOuter = std::string("private/var/mobile/") + fs::deathRowOuter;
 
 // Goal: a container on another file system goes by a rename, whatever is in it, and is found again after a stop.
@@ -300,7 +309,8 @@ TEST(DeathRowElsewhere, ContainersGoByARename) {
     }
 }
 
-// Goal: whatever lies under the row's name, only what the daemon put in is removed. Method: a user's and root's things.
+// Goal: whatever lies under the row's name, only what the daemon put in is removed, and a container goes all the same.
+// Method: a user's and root's things.
 TEST(DeathRowElsewhere, WhoseNameIsTaken) {
     if (!MountedHome::canBe())
         GTEST_SKIP() << "skipped: needs root to mount";
@@ -308,19 +318,63 @@ TEST(DeathRowElsewhere, WhoseNameIsTaken) {
     const MountedHome home(world.path());
     ASSERT_TRUE(home.mounted());
     world.load();
-    const std::tuple<std::uint32_t, mode_t, bool> rows[] = {{mobile, 0700, false}, {0, 0755, false}, {0, 0700, true}};
-    for (const auto& [owner, mode, works] : rows) {
+    const std::pair<std::uint32_t, mode_t> rows[] = {{mobile, 0700}, {0, 0755}, {0, 0700}};
+    for (const auto& [owner, mode] : rows) {
         SCOPED_TRACE(std::to_string(owner) + " " + std::to_string(mode));
         const std::string app = "app" + std::to_string(owner + mode);
         (void)world.make(app, application, true);
         world.makeDirectories(rowOuter + "/precious", 0, 0700);
         ASSERT_EQ(::chown(world.path(rowOuter).c_str(), owner, owner) | ::chmod(world.path(rowOuter).c_str(), mode), 0);
-        EXPECT_EQ(codeOf(world.create(app, application, true)),
-                  works ? ErrorCode::success : ErrorCode::transientRemovalFailed);
+        const auto again = world.create(app, application, true);
+        ASSERT_TRUE(again);
+        EXPECT_EQ(world.pass(), ErrorCode::success);
+        EXPECT_EQ(entriesBeside(*again), 1);
+        EXPECT_EQ(world.stage(*again), ErrorCode::success);
         EXPECT_EQ(world.pass(), ErrorCode::success);
         EXPECT_EQ(world.names(rowOuter), Names{"precious"});
         EXPECT_EQ(world.item(rowOuter), directoryOf(owner, mode));
         std::filesystem::remove_all(world.path(rowOuter));
+    }
+}
+
+// Goal: a container that was hidden beside itself goes in the end, and nothing that its owner puts in its place does.
+// Method: the row's name is taken, the first pass fails; then a pass, a boot, or another's directory under the name.
+TEST(DeathRowElsewhere, HiddenBesideItself) {
+    if (!MountedHome::canBe())
+        GTEST_SKIP() << "skipped: needs root to mount";
+    enum class Then { pass, boot, swap, bootAfterSwap };
+    for (const Then then : {Then::pass, Then::boot, Then::swap, Then::bootAfterSwap}) {
+        SCOPED_TRACE(static_cast<int>(then));
+        World world;
+        const MountedHome home(world.path());
+        ASSERT_TRUE(home.mounted());
+        world.load();
+        world.makeDirectories(rowOuter, mobile);
+        const FoundContainer container = world.make("app");
+        const FoundContainer kept = world.make("kept");
+        world.disk().arm({.error = EIO, .span = FaultSpan::fromThenOn, .filter = [](const DiskCallInfo& call) {
+                              return call.call == DiskCall::unlinkFile || call.subject.starts_with(fs::copyPrefix);
+                          }});
+        EXPECT_EQ(world.stage(container), ErrorCode::success);
+        world.drainDeathRow();
+        world.disk().disarm();
+        EXPECT_EQ(entriesBeside(kept), 2);
+        std::string hidden;
+        for (const auto& entry : std::filesystem::directory_iterator(parentOf(kept.path)))
+            if (entry.path().filename().string().starts_with(fs::copyPrefix))
+                hidden = entry.path();
+        const bool swaps = then == Then::swap || then == Then::bootAfterSwap;
+        if (swaps) {
+            world.makeDirectories("private/var/mobile/precious", 0, 0700);
+            world.makeDirectories("private/var/mobile/precious/inner");
+            world.move(hidden, "private/var/mobile/aside");
+            world.move("private/var/mobile/precious", hidden);
+        }
+        if (then == Then::boot || then == Then::bootAfterSwap)
+            world.reboot();
+        EXPECT_EQ(world.pass(), then == Then::swap ? ErrorCode::deathRowItemNotDestroyed : ErrorCode::success);
+        EXPECT_EQ(entriesBeside(kept), swaps ? 2 : 1);
+        EXPECT_EQ(isThere(hidden + "/inner"), swaps);
     }
 }
 
