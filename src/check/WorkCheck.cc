@@ -136,7 +136,7 @@ void WorkCheck::addJournal(const FileURL& url) {
             what = "is the journal of a replace that is done, or has not begun";
         else if (fileManager.itemExistsAtURL(journal->oldUrl))
             what = "is the journal of a replace that has not begun";
-        else if (fileManager.itemExistsAtURL(journal->stagingUrl))
+        else if (fileManager.itemExistsAtURL(journal->waitingUrl()))
             what = "is the journal of a replace that will be undone: its old container waits in staging";
         else
             what = "is the journal of a replace of which nothing is left";

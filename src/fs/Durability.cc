@@ -84,9 +84,13 @@ int Durability::beforeRemoval(int directory) const {
     return ordering(directory) == Ordering::journal ? 0 : disk_.syncFileSystem(directory);
 }
 
-int Durability::between(int changed, int next) const {
+bool Durability::keepsOrder(int changed, int next) const {
     // A journal keeps the order of its own file system alone.
-    return onOneFileSystem(changed, next) && ordering(changed) == Ordering::journal ? 0 : afterMove(changed);
+    return onOneFileSystem(changed, next) && ordering(changed) == Ordering::journal;
+}
+
+int Durability::between(int changed, int next) const {
+    return keepsOrder(changed, next) ? 0 : afterMove(changed);
 }
 
 int Durability::afterMove(int directory) const {

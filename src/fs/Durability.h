@@ -42,6 +42,8 @@ public:
     /// Between a change of names in one directory and one in another that must not be durable without it. 0 or a
     /// negative errno.
     [[nodiscard]] int between(int changed, int next) const;
+    /// Whether the file systems see to that themselves, so that `between` has nothing to wait for.
+    [[nodiscard]] bool keepsOrder(int changed, int next) const;
     /// After the move, before it is acknowledged; needs no lock. `directory` is where the name came to be.
     [[nodiscard]] int afterMove(int directory) const;
     /// The same for changes of names in two directories, which may lie on two file systems.

@@ -34,6 +34,22 @@ int makeIfMissing(platform::Disk& disk, int parent, const char* name) {
     return made == -EEXIST ? 0 : -made;
 }
 
+OpenResult openInner(int top, const char* inner) {
+    const OpenResult outer = openClosed(top, deathRowOuter);
+    return outer ? openClosed(outer->get(), inner) : OpenResult(outer.error());
+}
+
+OpenResult openOrMakeInner(platform::Disk& disk, int top, const char* inner) {
+    if (const int failed = makeIfMissing(disk, top, deathRowOuter))
+        return Errno(failed);
+    const OpenResult outer = openClosed(top, deathRowOuter);
+    if (!outer)
+        return outer.error();
+    if (const int failed = makeIfMissing(disk, outer->get(), inner))
+        return Errno(failed);
+    return openClosed(outer->get(), inner);
+}
+
 } // namespace
 
 ErrnoOr<MountTop> topOfMount(const PathResolver& resolver, const FileURL& url) {
@@ -66,26 +82,46 @@ FileURL deathRowBelow(const FileURL& top) {
     return top.appendingDirectory(deathRowOuter).appendingDirectory(deathRowInner);
 }
 
+FileURL asideBelow(const FileURL& top) {
+    return top.appendingDirectory(deathRowOuter).appendingDirectory(asideInner);
+}
+
 OpenResult openDeathRow(int top) {
-    const OpenResult outer = openClosed(top, deathRowOuter);
-    return outer ? openClosed(outer->get(), deathRowInner) : OpenResult(outer.error());
+    return openInner(top, deathRowInner);
+}
+
+OpenResult openAside(int top) {
+    return openInner(top, asideInner);
 }
 
 OpenResult openOrMakeDeathRow(platform::Disk& disk, int top) {
-    if (const int failed = makeIfMissing(disk, top, deathRowOuter))
-        return Errno(failed);
-    const OpenResult outer = openClosed(top, deathRowOuter);
-    if (!outer)
-        return outer.error();
-    if (const int failed = makeIfMissing(disk, outer->get(), deathRowInner))
-        return Errno(failed);
-    return openClosed(outer->get(), deathRowInner);
+    return openOrMakeInner(disk, top, deathRowInner);
+}
+
+OpenResult openOrMakeAside(platform::Disk& disk, int top) {
+    return openOrMakeInner(disk, top, asideInner);
+}
+
+OpenResult openAsideOf(const PathResolver& resolver, const FileURL& item) {
+    const FileURL aside = item.deletingLastPathComponent();
+    const FileURL top = aside.deletingLastPathComponent().deletingLastPathComponent();
+    if (asideBelow(top) != aside)
+        return Errno(EINVAL);
+    const auto opened = resolver.openDirectoryPath(top);
+    return opened ? openAside(opened->get()) : OpenResult(opened.error());
 }
 
 void removeEmptyDeathRow(platform::Disk& disk, int top) {
-    if (const OpenResult outer = openClosed(top, deathRowOuter))
-        if (const int removed = disk.removeDirectory(outer->get(), deathRowInner); removed == 0 || removed == -ENOENT)
-            (void)disk.removeDirectory(top, deathRowOuter);
+    const OpenResult outer = openClosed(top, deathRowOuter);
+    if (!outer)
+        return;
+    bool empty = true;
+    for (const char* inner : {deathRowInner, asideInner}) {
+        const int removed = disk.removeDirectory(outer->get(), inner);
+        empty = empty && (removed == 0 || removed == -ENOENT);
+    }
+    if (empty)
+        (void)disk.removeDirectory(top, deathRowOuter);
 }
 
 } // namespace zor::fs

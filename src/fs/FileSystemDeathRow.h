@@ -8,6 +8,9 @@
 // inner directory, which can have come to be in a closed directory by the daemon alone. A row that was renamed away is
 // lost, and the next move makes another.
 //
+// Beside the row, in TOP/.zorvaned-dead/com.veltra.zorvaned.aside, lies what is only out of the way for a moment and
+// may come back: a container that is being replaced, and what was copied here to take its place. A launch clears it.
+//
 // A stop leaves one directory or both, empty, or with items; the next pass finds them by their place. "The daemon's" is
 // the effective user's. All functions return a descriptor, 0, or an errno. Any thread.
 #pragma once
@@ -30,11 +33,18 @@ struct MountTop {
 
 /// How the row is called in messages.
 [[nodiscard]] FileURL deathRowBelow(const FileURL& top);
+/// The same of the directory beside it.
+[[nodiscard]] FileURL asideBelow(const FileURL& top);
 /// The row in an open directory, for reading and for naming items in it. ENOENT: there is none; EPERM: something that
 /// is not the daemon's has its name.
 [[nodiscard]] OpenResult openDeathRow(int top);
 [[nodiscard]] OpenResult openOrMakeDeathRow(platform::Disk& disk, int top);
-/// Leaves one that is not empty. The caller that moves an item in has to make sure that it is not removed before.
+[[nodiscard]] OpenResult openAside(int top);
+[[nodiscard]] OpenResult openOrMakeAside(platform::Disk& disk, int top);
+/// The directory beside the row that holds the item of that name, or an errno; judged as above.
+[[nodiscard]] OpenResult openAsideOf(const PathResolver& resolver, const FileURL& item);
+/// With the directory beside it; leaves what is not empty. The caller that moves an item in has to make sure that it is
+/// not removed before.
 void removeEmptyDeathRow(platform::Disk& disk, int top);
 
 } // namespace zor::fs

@@ -12,9 +12,11 @@ namespace zor::fs {
 /// How a copy across file systems is named until it is whole.
 inline constexpr const char* copyPrefix = ".zorvaned-copy-";
 
-/// The death row at the top of a file system (fs/FileSystemDeathRow.h), and the directory in it that holds the items.
+/// The closed directory at the top of a file system (fs/FileSystemDeathRow.h), and the directories in it: the one that
+/// holds what is to be deleted, and the one for what is only out of the way.
 inline constexpr const char* deathRowOuter = ".zorvaned-dead";
 inline constexpr const char* deathRowInner = "com.veltra.zorvaned.dead";
+inline constexpr const char* asideInner = "com.veltra.zorvaned.aside";
 
 [[nodiscard]] inline bool isCopyLeftover(std::string_view name) {
     return name.starts_with(copyPrefix);

@@ -18,10 +18,10 @@ Result<void> ContainerRemoval::stage(const ContainerToGo& container) {
     return needs_.boundary.run({function, __LINE__}, [&]() -> Result<void> {
         std::vector<FileURL> changed;
         needs_.cache.prepare(container.userId, container.containerClass);
-        auto staged = [&] {
+        auto staged = needs_.recovery.undisturbed([&] {
             const AllIdentifiersWriteLock lock(needs_.locks);
             return stage(container, changed, lock);
-        }();
+        });
         return conclude(std::move(staged), std::move(changed));
     });
 }
@@ -80,24 +80,15 @@ bool ContainerRemoval::takeAway(const FileURL& container, std::optional<std::uin
     }
     ZOR_LOG(needs_.log, logLevelDebug, "Couldn't stage for deletion from %s to %s: %s", container.c_str(),
             destination.c_str(), moved.error().text().c_str());
-    // An earlier container of a well-known name may still wait on death row under that name. This one goes beside it: a
-    // stop while it is removed in place would leave half of it under the name it has.
+    // An earlier container of a well-known name may still wait on death row under that name. This one goes beside it.
     const bool nameIsTaken = moved.error().isPosix(ENOTEMPTY) || moved.error().isPosix(EEXIST);
     if (nameIsTaken && needs_.deathRow._moveItemAtURLToDeathRow(container, StartDeletionThread::no, owner)) {
         changed.push_back(deathRow);
         return true;
     }
-    // The cause that stopped the move would stop the removal too, half-way; and another's directory is not ours to
-    // remove. Then it stays whole.
-    const bool stays = moved.error().isOwnShortage() || moved.error().isPosix(DeathRow::notTheContainer);
-    const auto removed = stays ? Result<void>(moved.error()) : needs_.fileManager.removeItemAtURL(container);
-    if (!removed) {
-        makeError(needs_.log, {function, __LINE__}, ErrorCode::listForDeletionFailed, &removed.error(), LogFlag::yes,
-                  "Failed to delete container at %s: %s", container.c_str(), removed.error().text().c_str());
-        return false;
-    }
-    changed.push_back(container.deletingLastPathComponent());
-    return true;
+    makeError(needs_.log, {function, __LINE__}, ErrorCode::listForDeletionFailed, &moved.error(), LogFlag::yes,
+              "Failed to delete container at %s: %s", container.c_str(), moved.error().text().c_str());
+    return false;
 }
 
 } // namespace zor

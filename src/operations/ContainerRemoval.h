@@ -21,6 +21,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace zor {
@@ -54,6 +55,11 @@ public:
                        const AllIdentifiersWriteLock& lock);
 
     // The steps of it, for who stages several.
+    /// ReplaceRecovery::undisturbed, for who takes the lock.
+    template <typename Step>
+    auto undisturbed(Step&& step) {
+        return needs_.recovery.undisturbed(std::forward<Step>(step));
+    }
     /// The record; nullptr when there is none.
     Result<std::shared_ptr<ZORMetadata>> find(const ContainerToGo& container, const AllIdentifiersWriteLock& lock);
     /// `changed` gets the directories to be synced.

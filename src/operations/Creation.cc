@@ -95,11 +95,13 @@ Result<void> Creation::checkRequest(const Caller& caller, std::uint32_t userId, 
 
 Result<std::optional<FoundContainer>> Creation::lookedFor(const Wanted& wanted,
                                                           std::optional<ContainerMaker::Built>* built) {
-    needs_.cache.prepare(wanted.userId, wanted.containerClass, wanted.options.transient);
-    if (wanted.options.createIfNecessary && !wanted.caller.ownsRoot())
-        (void)needs_.cache.heldByUser(wanted.userId);
-    const AllIdentifiersWriteLock lock(needs_.locks);
-    return createOrLookup(wanted, built, lock);
+    return needs_.recovery.undisturbed([&] {
+        needs_.cache.prepare(wanted.userId, wanted.containerClass, wanted.options.transient);
+        if (wanted.options.createIfNecessary && !wanted.caller.ownsRoot())
+            (void)needs_.cache.heldByUser(wanted.userId);
+        const AllIdentifiersWriteLock lock(needs_.locks);
+        return createOrLookup(wanted, built, lock);
+    });
 }
 
 Result<std::optional<FoundContainer>> Creation::createOrLookup(const Wanted& wanted,

@@ -51,10 +51,10 @@ Result<void> Deletion::stageForDeleteContainersWithUsers(const DeletionBatch& ba
         for (std::size_t index = 0; index < count && index < batch.users.size(); ++index)
             prepare(batch, index);
         while (progress.next < count) {
-            auto staged = [&] {
+            auto staged = needs_.removal.undisturbed([&] {
                 const AllIdentifiersWriteLock lock(needs_.locks);
                 return stageNext(batch, progress, lock);
-            }();
+            });
             if (!staged)
                 return needs_.removal.conclude(std::move(staged), std::move(progress.changed));
             if (const auto change = std::exchange(progress.unsettled, std::nullopt))

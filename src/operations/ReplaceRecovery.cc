@@ -1,6 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "operations/ReplaceRecovery.h"
 
+#include "fs/FileSystemDeathRow.h"
+#include "fs/ItemStatus.h"
 #include "store/ReplaceJournal.h"
 
 #include <algorithm>
@@ -62,11 +64,24 @@ Found look(ZORFileManager& fileManager, const FileURL& url) {
     return fileManager.itemDoesNotExistAtURL(url) ? Found::absent : Found::unknown;
 }
 
+/// Of the old one in its waiting place. A closed directory that has gone tells nothing: perhaps its file system is not
+/// there yet.
+Found lookAside(ZORFileManager& fileManager, const ReplaceJournal& journal) {
+    if (journal.asideUrl.empty())
+        return look(fileManager, journal.stagingUrl);
+    const auto aside = fs::openAsideOf(fileManager.resolver(), journal.asideUrl);
+    struct stat status{};
+    const int failure =
+        aside ? fs::statusOfName(aside->get(), std::string(journal.asideUrl.lastPathComponent()).c_str(), status)
+              : EAGAIN;
+    return failure == 0 ? Found::present : failure == ENOENT ? Found::absent : Found::unknown;
+}
+
 /// nullptr when what matters cannot be examined.
 const State* stateOf(ZORFileManager& fileManager, const ReplaceJournal& journal) {
     const Found destination = look(fileManager, journal.destUrl);
     const Found old = journal.oldUrl == journal.destUrl ? Found::absent : look(fileManager, journal.oldUrl);
-    const Found staging = look(fileManager, journal.stagingUrl);
+    const Found staging = lookAside(fileManager, journal);
     const auto* const found = std::ranges::find_if(states, [&](const State& state) {
         return matches(state.old, old) && matches(state.destination, destination) && matches(state.staging, staging);
     });
@@ -108,7 +123,8 @@ Result<void> ReplaceRecovery::_recoverFromReplaceOperationsWithError() {
         if (unreadable || stopped)
             waiting_.add({.journalUrl = item,
                           .oldUrl = journal ? journal->oldUrl : FileURL(),
-                          .destUrl = journal ? journal->destUrl : FileURL()});
+                          .destUrl = journal ? journal->destUrl : FileURL(),
+                          .waitingUrl = journal ? journal->asideUrl : FileURL()});
     }
     waiting_.setUnlisted(false);
     if (stopped)
@@ -125,6 +141,23 @@ std::optional<std::set<std::string, std::less<>>> ReplaceRecovery::stagedByJourn
     for (const FileURL& item : items.value_or(std::vector<FileURL>()))
         names.emplace(ReplaceJournal::stagingNameFor(item));
     return names;
+}
+
+std::uint64_t ReplaceRecovery::sweepAside(const std::set<std::string, std::less<>>& kept) {
+    std::uint64_t swept = 0;
+    for (const FileURL& place : needs_.configuration.placesOfContainers()) {
+        const auto top = fs::topOfMount(needs_.fileManager.resolver(), place);
+        const auto aside = top ? fs::openAside(top->directory.get()) : fs::OpenResult(top.error());
+        if (!aside)
+            continue;
+        (void)needs_.fileManager.forEachItemIn(
+            aside->get(), fs::asideBelow(top->url), ZORFileManager::Leftovers::shown, [&](int, const FileURL& item) {
+                if (!kept.contains(item.lastPathComponent()))
+                    swept += needs_.deathRow._moveItemAtURLToDeathRow(item, StartDeletionThread::no) ? 1 : 0;
+                return needs_.report.goOn();
+            });
+    }
+    return swept;
 }
 
 std::size_t ReplaceRecovery::journalCount() {
@@ -153,7 +186,7 @@ Result<void> ReplaceRecovery::applyReplaceJournal(const ReplaceJournal& journal)
     const Log& log = needs_.log;
     const auto failed = [&](const ZORError* cause) {
         return makeError(log, {recoverFunction, __LINE__}, ErrorCode::journalUnusable, cause, LogFlag::yes,
-                         "Failed to recover replace move: %s to %s", journal.stagingUrl.c_str(),
+                         "Failed to recover replace move: %s to %s", journal.waitingUrl().c_str(),
                          journal.oldUrl.c_str());
     };
     // What cannot be examined may be there or not. The journal waits for a launch that can tell.
@@ -165,17 +198,21 @@ Result<void> ReplaceRecovery::applyReplaceJournal(const ReplaceJournal& journal)
     if (state->recovery == Recovery::moveOldBack) {
         if (log.writes(logLevelDebug))
             log.write(logLevelDebug, recoverFunction, "Recovering from failed replace by moving: %s to %s",
-                      journal.stagingUrl.c_str(), journal.oldUrl.c_str());
+                      journal.waitingUrl().c_str(), journal.oldUrl.c_str());
         const auto moved = [&]() -> Result<void> {
             ZORFileManager& fileManager = needs_.fileManager;
             const FileURL place = journal.oldUrl.deletingLastPathComponent();
             const auto owner = needs_.configuration.ownerOfClassDirectory(place);
             if (!owner)
                 return posixError({recoverFunction, __LINE__}, EINVAL, "%s holds no containers", place.c_str());
+            const FileURL& waiting = journal.waitingUrl();
+            fs::OpenResult aside = fs::openAsideOf(fileManager.resolver(), waiting);
             const auto from =
-                TRY(fileManager.openDirectoryOf(ownerUnchanged, journal.stagingUrl.deletingLastPathComponent()));
+                !journal.asideUrl.empty() && aside
+                    ? std::move(*aside)
+                    : TRY(fileManager.openDirectoryOf(ownerUnchanged, journal.stagingUrl.deletingLastPathComponent()));
             const auto to = TRY(fileManager.openDirectoryOf(*owner, place));
-            TRY(fileManager.moveItem(from.get(), journal.stagingUrl, to.get(), journal.oldUrl, needs_.report.check()));
+            TRY(fileManager.moveItem(from.get(), waiting, to.get(), journal.oldUrl, needs_.report.check()));
             return {};
         }();
         if (!moved)

@@ -23,12 +23,14 @@
 #include "store/ZORContainerCache.h"
 #include "store/ZORGlobalConfiguration.h"
 
+#include <cerrno>
 #include <cstdint>
 #include <functional>
 #include <memory>
 #include <optional>
 #include <set>
 #include <string>
+#include <string_view>
 
 namespace zor {
 
@@ -54,11 +56,33 @@ public:
     /// Names in staging that journals on the disk still speak of; nullopt when it cannot be told which there are.
     [[nodiscard]] std::optional<std::set<std::string, std::less<>>> stagedByJournals();
     [[nodiscard]] std::size_t journalCount();
+    /// What lies aside on other file systems than staging's and no journal names goes to death row. How much went. At
+    /// the launch.
+    std::uint64_t sweepAside(const std::set<std::string, std::less<>>& kept);
 
     /// Whether no replace waits; costs one load.
     [[nodiscard]] bool noneWaits() const { return waiting_.none(); }
-    /// The journal of a replace under way stays on the disk, for a later try.
+    /// The journal of a replace stays on the disk, for a later try.
     void leave(WaitingReplaces::Waiting waiting) { waiting_.add(std::move(waiting)); }
+    /// For replaces that wait for the disk without the lock.
+    [[nodiscard]] WaitingReplaces& underWay() { return waiting_; }
+    /// Runs `step`, which takes the lock, until it meets no replace that is under way and has to do with its container:
+    /// before it comes again, that one has ended. Without a lock.
+    template <typename Step>
+    auto undisturbed(Step&& step) -> decltype(step()) {
+        for (;;) {
+            const std::uint64_t ended = waiting_.ended();
+            auto result = step();
+            if (result || !metOneUnderWay(result.error()))
+                return result;
+            waiting_.awaitMoreThan(ended);
+        }
+    }
+    /// Whether an error of the functions below says that: nothing has been done.
+    [[nodiscard]] static bool metOneUnderWay(const ZORError& error) { return error.isPosix(EINPROGRESS); }
+    /// The same without trying anything: for who holds a container's own lock alone.
+    [[nodiscard]] Result<void> refuseIfUnderWay(std::uint32_t userId, ContainerClass containerClass,
+                                                std::string_view identifier) const;
 
     /// A container that is about to be made, or taken from its place.
     struct ContainerAtStake {
@@ -68,9 +92,9 @@ public:
         FileURL place; // empty when it has none
     };
     /// Tries the replaces that wait and that could bring back a container of this identifier, or one to this place.
-    /// Whether there were any; error 35 while one is left.
+    /// Whether there were any; error 35 while one is left; metOneUnderWay.
     Result<bool> settleReplaces(const ContainerAtStake& atStake, const AllIdentifiersWriteLock& lock);
-    /// The cache's record, or nullptr, when no replace that waits has to do with it. Error 35.
+    /// The cache's record, or nullptr, when no replace that waits has to do with it. Error 35; metOneUnderWay.
     Result<std::shared_ptr<ZORMetadata>> settledContainer(std::uint32_t userId, ContainerClass containerClass,
                                                           const std::string* identifier, const UUID& uuid,
                                                           const AllIdentifiersWriteLock& lock);

@@ -53,15 +53,24 @@ bool ReplaceRecovery::mayComeBack(const FileURL& staged, const WaitingReplaces::
     return ::geteuid() != 0 || status.st_uid == (owner == ownerUnchanged ? ::geteuid() : owner);
 }
 
+Result<void> ReplaceRecovery::refuseIfUnderWay(std::uint32_t userId, ContainerClass containerClass,
+                                               std::string_view identifier) const {
+    if (!waiting_.isUnderWay(userId, containerClass, identifier))
+        return {};
+    return posixError(ZOR_HERE, EINPROGRESS, "a replace of %s is under way", ZOR_SHOWN(std::string(identifier)));
+}
+
 Result<bool> ReplaceRecovery::settleReplaces(const ContainerAtStake& atStake, const AllIdentifiersWriteLock& /*held*/) {
+    TRY(refuseIfUnderWay(atStake.userId, atStake.containerClass, atStake.identifier));
     if (waiting_.none())
         return false;
     if (waiting_.unlisted())
         TRY(listReplacesAgain(atStake));
     bool settled = false;
     for (const WaitingReplaces::Waiting& one : waiting_.all()) {
-        const FileURL staged =
-            needs_.configuration.stagingDirectory().appendingDirectory(ReplaceJournal::stagingNameFor(one.journalUrl));
+        const FileURL staged = one.waitingUrl.empty() ? needs_.configuration.stagingDirectory().appendingDirectory(
+                                                            ReplaceJournal::stagingNameFor(one.journalUrl))
+                                                      : one.waitingUrl;
         if (!mayComeBack(staged, one, atStake))
             continue;
         auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(needs_.log, needs_.fileManager, one.journalUrl);

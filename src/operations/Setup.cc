@@ -129,7 +129,7 @@ std::uint64_t Setup::sweepStaging() {
     if (!listed && !listed.error().isPosix(ENOENT))
         needs_.log.write(logLevelError, launchFunction, "Failed to get items at staging URL%s : %s", staging.c_str(),
                          listed.error().text().c_str());
-    return swept;
+    return swept + needs_.recovery.sweepAside(*kept);
 }
 
 bool Setup::showsContainers(std::uint32_t userId) {

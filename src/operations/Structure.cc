@@ -9,6 +9,10 @@
 
 namespace zor {
 
+namespace {
+constexpr const char* regenerateFunction = "regenerateDirectoryUUIDForUser";
+}
+
 using platform::FileDescriptor;
 
 Result<void> Structure::recreateDefaultStructureForUser(const ContainerAddress& address) {
@@ -64,53 +68,57 @@ Result<void> Structure::makeSubdirectories(const ContainerLayout& layout, int pr
 
 Result<void> Structure::regenerateDirectoryUUIDForUser(const ContainerAddress& address) {
     return needs_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
-        constexpr const char* function = "regenerateDirectoryUUIDForUser";
-        TRY(checkAddress(needs_.log, function, address));
-        FileURL newUrl;
-        std::shared_ptr<ZORMetadata> renamed;
-        if (!needs_.recovery.noneWaits()) {
-            const AllIdentifiersWriteLock lock(needs_.locks);
-            (void)TRY(needs_.recovery.settledContainer(address.userId, address.containerClass,
-                                                       address.identifier ? &*address.identifier : nullptr,
-                                                       *address.uuid, lock));
-        }
-        {
-            const IdentifierWriteLock lock(needs_.locks, address.lockName());
-            const auto record = TRY(knownContainer(needs_.log, needs_.cache, function, address, lock));
-            const FileURL oldUrl = record->url();
-            const FileURL place = oldUrl.deletingLastPathComponent();
-            newUrl = place.appendingDirectory(UUID::random().string());
-            const auto moved = [&]() -> Result<void> {
-                const std::uint32_t owner =
-                    ZORGlobalConfiguration::ownerOfClassDirectory(address.containerClass, address.userId);
-                const auto directory = TRY(needs_.fileManager.openDirectoryOf(owner, place));
-                TRY(needs_.fileManager.openDirectoryOf(owner, oldUrl));
-                TRY(needs_.fileManager.moveItem(directory.get(), oldUrl, directory.get(), newUrl));
-                return {};
-            }();
-            if (!moved)
-                return makeError(needs_.log, {function, __LINE__}, ErrorCode::directoryNotRenamed, &moved.error(),
-                                 LogFlag::yes, "Failed to move dir: %s to new UUID dir: %s", oldUrl.c_str(),
-                                 newUrl.c_str());
-            const bool transient = record->transient(); // the mapping is the live one's
-            if (isPerUserClass(address.containerClass) && !transient &&
-                !needs_.mappings._setSandboxContainerMappingForUser(address.userId, record->identifier(),
-                                                                    address.containerClass, newUrl))
-                needs_.log.write(logLevelError, function, "Failed to set container mapping in regenerate operation");
-            record->setDurable(false);
-            const auto added =
-                needs_.cache.addContainerMetadata(record, address.userId, ContainerPlace(newUrl), transient);
-            if (!added)
-                return makeError(needs_.log, {function, __LINE__}, ErrorCode::cacheAddFailed, &added.error(),
-                                 LogFlag::yes, "Failed to add to cache: %s, url: %s, transient: %d",
-                                 ZOR_SHOWN(record->identifier()), newUrl.c_str(), transient);
-            renamed = record;
-        }
-        if (const auto failed = needs_.moves.syncDirectories({newUrl.deletingLastPathComponent()}))
-            return needs_.moves.notLasting(function, ErrorCode::directoryNotRenamed, newUrl, *failed);
-        renamed->setDurable(true);
-        return {};
+        TRY(checkAddress(needs_.log, regenerateFunction, address));
+        return needs_.recovery.undisturbed([&] { return regenerate(address); });
     });
+}
+
+Result<void> Structure::regenerate(const ContainerAddress& address) {
+    constexpr const char* function = regenerateFunction;
+    FileURL newUrl;
+    std::shared_ptr<ZORMetadata> renamed;
+    if (!needs_.recovery.noneWaits()) {
+        const AllIdentifiersWriteLock lock(needs_.locks);
+        (void)TRY(needs_.recovery.settledContainer(address.userId, address.containerClass,
+                                                   address.identifier ? &*address.identifier : nullptr, *address.uuid,
+                                                   lock));
+    }
+    {
+        const IdentifierWriteLock lock(needs_.locks, address.lockName());
+        const auto record = TRY(knownContainer(needs_.log, needs_.cache, function, address, lock));
+        TRY(needs_.recovery.refuseIfUnderWay(address.userId, address.containerClass, record->identifier()));
+        const FileURL oldUrl = record->url();
+        const FileURL place = oldUrl.deletingLastPathComponent();
+        newUrl = place.appendingDirectory(UUID::random().string());
+        const auto moved = [&]() -> Result<void> {
+            const std::uint32_t owner =
+                ZORGlobalConfiguration::ownerOfClassDirectory(address.containerClass, address.userId);
+            const auto directory = TRY(needs_.fileManager.openDirectoryOf(owner, place));
+            TRY(needs_.fileManager.openDirectoryOf(owner, oldUrl));
+            TRY(needs_.fileManager.moveItem(directory.get(), oldUrl, directory.get(), newUrl));
+            return {};
+        }();
+        if (!moved)
+            return makeError(needs_.log, {function, __LINE__}, ErrorCode::directoryNotRenamed, &moved.error(),
+                             LogFlag::yes, "Failed to move dir: %s to new UUID dir: %s", oldUrl.c_str(),
+                             newUrl.c_str());
+        const bool transient = record->transient(); // the mapping is the live one's
+        if (isPerUserClass(address.containerClass) && !transient &&
+            !needs_.mappings._setSandboxContainerMappingForUser(address.userId, record->identifier(),
+                                                                address.containerClass, newUrl))
+            needs_.log.write(logLevelError, function, "Failed to set container mapping in regenerate operation");
+        record->setDurable(false);
+        const auto added = needs_.cache.addContainerMetadata(record, address.userId, ContainerPlace(newUrl), transient);
+        if (!added)
+            return makeError(needs_.log, {function, __LINE__}, ErrorCode::cacheAddFailed, &added.error(), LogFlag::yes,
+                             "Failed to add to cache: %s, url: %s, transient: %d", ZOR_SHOWN(record->identifier()),
+                             newUrl.c_str(), transient);
+        renamed = record;
+    }
+    if (const auto failed = needs_.moves.syncDirectories({newUrl.deletingLastPathComponent()}))
+        return needs_.moves.notLasting(function, ErrorCode::directoryNotRenamed, newUrl, *failed);
+    renamed->setDurable(true);
+    return {};
 }
 
 } // namespace zor

@@ -43,6 +43,8 @@ public:
     Result<void> regenerateDirectoryUUIDForUser(const ContainerAddress& address);
 
 private:
+    /// With metOneUnderWay.
+    Result<void> regenerate(const ContainerAddress& address);
     /// The standard subdirectories of the container that `changed` begins with; each is added to it. New ones get the
     /// protection class.
     Result<void> makeSubdirectories(const ContainerLayout& layout, int protectionClass, std::vector<FileURL>& changed);

@@ -1,8 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ReplaceJournal.h"
 
+#include "base/BlockingScope.h"
 #include "fs/DictionaryFile.h"
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <utility>
@@ -15,10 +17,15 @@ constexpr std::string_view oldKey = "ZORReplaceOperationOldURL";
 constexpr std::string_view newKey = "ZORReplaceOperationNewURL";
 constexpr std::string_view stagingKey = "ZORReplaceOperationStagingURL";
 constexpr std::string_view destKey = "ZORReplaceOperationDestURL";
+constexpr std::string_view asideKey = "ZORReplaceOperationAsideURL"; // may be missing
+
+bool isPlace(const std::string* path) {
+    return path && path->starts_with('/') && !containsDotDotPathComponents(*path);
+}
 
 constexpr std::string_view fileSuffix = ".plist";
 
-/// Four paths; each may have 4,096 bytes.
+/// Five paths; each may have 4,096 bytes.
 constexpr std::size_t journalBytesMax = std::size_t{64} << 10;
 
 std::string shownOf(const plist::Dictionary& content, std::string_view key) {
@@ -44,10 +51,12 @@ Result<void> ReplaceJournal::_writeToDiskReplaceAt(const Log& log, ZORFileManage
         return makeError(log, ZOR_HERE, ErrorCode::journalValuesInvalid, nullptr, LogFlag::yes,
                          "Invalid Replace File Info: old: %s, new: %s, staging: %s, dest: %s", oldUrl.c_str(),
                          newUrl.c_str(), stagingUrl.c_str(), destUrl.c_str());
-    const plist::Dictionary content{{std::string(oldKey), oldUrl.path()},
-                                    {std::string(newKey), newUrl.path()},
-                                    {std::string(stagingKey), stagingUrl.path()},
-                                    {std::string(destKey), destUrl.path()}};
+    plist::Dictionary content{{std::string(oldKey), oldUrl.path()},
+                              {std::string(newKey), newUrl.path()},
+                              {std::string(stagingKey), stagingUrl.path()},
+                              {std::string(destKey), destUrl.path()}};
+    if (!asideUrl.empty())
+        content.set(asideKey, asideUrl.path());
     const auto written =
         writeToURL(content, url, writeAtomically | writeWithoutProtection, journalBytesMax, fileManager);
     if (!written)
@@ -66,14 +75,19 @@ Result<ReplaceJournal> ReplaceJournal::_readAndValidateReplaceFileAtUrl(const Lo
     const std::array keys = {oldKey, newKey, stagingKey, destKey};
     for (std::size_t i = 0; i < keys.size(); ++i) {
         const std::string* path = content->string(keys[i]);
-        if (!path || !path->starts_with('/') || containsDotDotPathComponents(*path))
+        if (!isPlace(path))
             return makeError(log, ZOR_HERE, ErrorCode::journalUnusable, nullptr, LogFlag::yes,
                              "Invalid replace data: Old: %s, New: %s, Staging: %s, Dest: %s",
                              shownOf(*content, oldKey).c_str(), shownOf(*content, newKey).c_str(),
                              shownOf(*content, stagingKey).c_str(), shownOf(*content, destKey).c_str());
         urls[i] = FileURL::directory(*path);
     }
-    return ReplaceJournal{.oldUrl = urls[0], .newUrl = urls[1], .stagingUrl = urls[2], .destUrl = urls[3]};
+    const std::string* const aside = content->string(asideKey);
+    return ReplaceJournal{.oldUrl = urls[0],
+                          .newUrl = urls[1],
+                          .stagingUrl = urls[2],
+                          .destUrl = urls[3],
+                          .asideUrl = isPlace(aside) ? FileURL::directory(*aside) : FileURL()};
 }
 
 bool ReplaceJournal::mayStillBeRead(const ZORError& readFailure) {
@@ -91,13 +105,13 @@ void ReplaceJournal::moveToRoot(const std::string& rootPath, const FileURL& stag
     const std::string oldRoot = staging.substr(0, staging.size() - tail.size());
     if (oldRoot == root)
         return;
-    for (FileURL* url : {&oldUrl, &newUrl, &stagingUrl, &destUrl})
+    for (FileURL* url : {&oldUrl, &newUrl, &stagingUrl, &destUrl, &asideUrl})
         if (url->path().starts_with(oldRoot + "/"))
             *url = FileURL::directory(root + url->path().substr(oldRoot.size()));
 }
 
 std::string ReplaceJournal::text() const {
-    return "old: " + oldUrl.path() + ", new: " + newUrl.path() + ", staging: " + stagingUrl.path() +
+    return "old: " + oldUrl.path() + ", new: " + newUrl.path() + ", staging: " + waitingUrl().path() +
            ", dest: " + destUrl.path();
 }
 
@@ -106,6 +120,7 @@ using platform::MutexLock;
 void WaitingReplaces::add(Waiting waiting) {
     const MutexLock held(mutex_);
     std::erase_if(waiting_, [&](const Waiting& one) { return one.journalUrl == waiting.journalUrl; });
+    waiting_.reserve(waiting_.size() + underWay_.size() + 1);
     waiting_.push_back(std::move(waiting));
     update();
 }
@@ -130,6 +145,50 @@ void WaitingReplaces::setUnlisted(bool unlisted) {
     const MutexLock held(mutex_);
     unlisted_ = unlisted;
     update();
+}
+
+void WaitingReplaces::begin(Waiting replace, Containers containers) {
+    const MutexLock held(mutex_);
+    waiting_.reserve(waiting_.size() + underWay_.size() + 1); // for each that does not come to its end
+    underWay_.push_back({.replace = std::move(replace), .containers = std::move(containers)});
+    update();
+}
+
+void WaitingReplaces::end(const FileURL& journalUrl, Ended how) noexcept {
+    const MutexLock held(mutex_);
+    const auto one = std::ranges::find_if(
+        underWay_, [&](const UnderWay& underWay) { return underWay.replace.journalUrl == journalUrl; });
+    if (one == underWay_.end())
+        return;
+    if (how == Ended::waits)
+        waiting_.push_back(std::move(one->replace));
+    underWay_.erase(one);
+    ++ended_;
+    update();
+    oneEnded_.broadcast();
+}
+
+bool WaitingReplaces::isUnderWay(std::uint32_t userId, ContainerClass containerClass,
+                                 std::string_view identifier) const {
+    if (noneUnderWay_.load(std::memory_order_acquire))
+        return false;
+    const MutexLock held(mutex_);
+    return std::ranges::any_of(underWay_, [&](const UnderWay& one) {
+        return one.containers.userId == userId && one.containers.containerClass == containerClass &&
+               std::ranges::find(one.containers.identifiers, identifier) != one.containers.identifiers.end();
+    });
+}
+
+std::uint64_t WaitingReplaces::ended() const {
+    const MutexLock held(mutex_);
+    return ended_;
+}
+
+void WaitingReplaces::awaitMoreThan(std::uint64_t ended) const {
+    const platform::BlockingScope blocking;
+    const MutexLock held(mutex_);
+    while (ended_ <= ended)
+        oneEnded_.wait(mutex_);
 }
 
 } // namespace zor

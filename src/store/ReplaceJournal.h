@@ -5,13 +5,18 @@
 // Its name is a random UUID, which also names the place in staging where the old container waits meanwhile.
 #pragma once
 
+#include "base/ContainerClass.h"
 #include "base/FileURL.h"
 #include "base/Mutex.h"
 #include "base/ZORError.h"
 #include "fs/ZORFileManager.h"
 #include "ipc/UUID.h"
 
+#include <array>
 #include <atomic>
+#include <cstdint>
+#include <string>
+#include <string_view>
 #include <vector>
 
 namespace zor {
@@ -21,7 +26,11 @@ struct ReplaceJournal {
     FileURL newUrl;     // the new one, before the replace
     FileURL stagingUrl; // where the old one waits
     FileURL destUrl;    // where the new one ends up
+    /// Where the old one waits when staging is on another file system: beside the death row of its own. Else empty.
+    FileURL asideUrl{};
 
+    /// The place where the old one waits.
+    [[nodiscard]] const FileURL& waitingUrl() const { return asideUrl.empty() ? stagingUrl : asideUrl; }
     /// "UUID.plist" in the Replace directory.
     [[nodiscard]] static FileURL urlFor(const FileURL& replaceDirectory, const UUID& uuid);
     /// The name in staging of the old container of the journal at `url`, which need not be readable.
@@ -43,9 +52,12 @@ struct ReplaceJournal {
     [[nodiscard]] std::string text() const;
 };
 
-/// Replaces that are neither done nor undone: their journal is on the disk although none is under way, since a move
-/// back failed, or the sync behind a move, or the reading of the journal. The old container of each may still come back
-/// from staging, at a later try or at the next launch.
+/// Replaces whose journal is on the disk and counts.
+///
+/// Those that wait are neither done nor undone although nobody is at work on them, since a move back failed, or the
+/// sync behind a move, or the reading of the journal: the old container of each may still come back, at a later try or
+/// at the next launch. Those that are under way have moved something, and their thread waits for the disk without a
+/// lock: whoever has to do with one of their containers waits for that one to end.
 ///
 /// Ordinarily there are none, and a look costs one load. One mutex; any thread. All of it ends with the process:
 /// the next launch reads the journals.
@@ -53,11 +65,20 @@ class WaitingReplaces {
 public:
     struct Waiting {
         FileURL journalUrl;
-        // The old container's place, and the one meant for the new; empty while the journal cannot be read.
+        // The old container's place, the one meant for the new, and the one where the old one waits; empty while the
+        // journal cannot be read.
         FileURL oldUrl{};
         FileURL destUrl{};
+        FileURL waitingUrl{};
+    };
+    /// The containers of a replace that is under way are of one user and class.
+    struct Containers {
+        std::uint32_t userId = 0;
+        ContainerClass containerClass = ContainerClass::undefined;
+        std::array<std::string, 2> identifiers{};
     };
 
+    /// Whether none waits.
     [[nodiscard]] bool none() const { return none_.load(std::memory_order_acquire); }
     void add(Waiting waiting);
     void remove(const FileURL& journalUrl);
@@ -66,13 +87,34 @@ public:
     [[nodiscard]] bool unlisted() const;
     void setUnlisted(bool unlisted);
 
+    void begin(Waiting replace, Containers containers);
+    /// One that has not come to its end waits from now on. Needs no memory; no journal of that name: nothing happens.
+    enum class Ended { settled, waits };
+    void end(const FileURL& journalUrl, Ended how) noexcept;
+    [[nodiscard]] bool isUnderWay(std::uint32_t userId, ContainerClass containerClass,
+                                  std::string_view identifier) const;
+    /// How many have ended. A caller that met one under way after it had asked waits until there are more.
+    [[nodiscard]] std::uint64_t ended() const;
+    void awaitMoreThan(std::uint64_t ended) const;
+
 private:
-    void update() ZOR_REQUIRES(mutex_) { none_.store(!unlisted_ && waiting_.empty(), std::memory_order_release); }
+    struct UnderWay {
+        Waiting replace;
+        Containers containers;
+    };
+    void update() ZOR_REQUIRES(mutex_) {
+        none_.store(!unlisted_ && waiting_.empty(), std::memory_order_release);
+        noneUnderWay_.store(underWay_.empty(), std::memory_order_release);
+    }
 
     mutable platform::Mutex mutex_;
+    mutable platform::ConditionVariable oneEnded_;
     std::vector<Waiting> waiting_ ZOR_GUARDED_BY(mutex_);
+    std::vector<UnderWay> underWay_ ZOR_GUARDED_BY(mutex_);
+    std::uint64_t ended_ ZOR_GUARDED_BY(mutex_) = 0;
     bool unlisted_ ZOR_GUARDED_BY(mutex_) = false;
     std::atomic<bool> none_{true};
+    std::atomic<bool> noneUnderWay_{true};
 };
 
 } // namespace zor

@@ -114,7 +114,7 @@ std::string judgeReplacement(const std::string& root, bool acted, const Acknowle
     return whole ? "" : "the content is " + now.content;
 }
 
-Scenario replacement(const std::string& name, OldOne kind) {
+Scenario replacement(const std::string& name, OldOne kind, bool exchanges = true) {
     const auto fresh = std::make_shared<Acknowledged>();
     const auto makeFresh = [=](Device& device) { *fresh = makeWithContent(device, true, "new"); };
     Scenario scenario = changing(
@@ -127,6 +127,7 @@ Scenario replacement(const std::string& name, OldOne kind) {
         });
     if (kind == OldOne::none)
         scenario.prepare = makeFresh;
+    scenario.exchanges = exchanges;
     scenario.afterOneError = [=](const std::string& root) -> std::string {
         const Changed waiting = look(root, true);
         return waiting.content == "missing" || waiting.uuid == fresh->uuid ? "" : "the new one has the old one's UUID";
@@ -280,6 +281,7 @@ std::vector<Scenario> changeScenarios() {
     const std::string replace = "replace";
     const std::string keeping = "replace that keeps the UUID";
     return {atHome(replacement(replace, OldOne::replaced)),
+            atHome(replacement(replace + " without exchange", OldOne::replaced, false)),
             replacement(keeping, OldOne::replacedAndUuidKept),
             replacement("replace of nothing", OldOne::none),
             atHome(recovery(replace, OldOne::replaced)),

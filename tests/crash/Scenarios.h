@@ -21,6 +21,8 @@ void must(bool happened, const char* what);
 struct Scenario {
     std::string name;
     bool worksAtHome = false;
+    /// Whether the device's file systems exchange names.
+    bool exchanges = true;
     /// Runs before the first fault or cut, on a launched daemon. What it puts into `promised` stays promised.
     std::function<void(Device&)> prepare;
     /// Puts what was acknowledged into `promised`.

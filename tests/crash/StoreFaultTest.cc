@@ -25,6 +25,7 @@ std::unique_ptr<FaultWorld> makeWorld(const std::string& parent, Home home, cons
     auto world = std::make_unique<FaultWorld>(disk, parent, home);
     // The setup of the boot has its own scenario; without it, the directories that operations make are missing.
     (void)world->device.marker.make();
+    world->device.exchanges = scenario.exchanges;
     world->device.start(disk, world->probe());
     scenario.prepare(world->device);
     return world;
@@ -126,8 +127,9 @@ TEST_P(DiskFaultTest, StandsEveryStop) {
 INSTANTIATE_TEST_SUITE_P(Store, StoreFaultTest, ::testing::ValuesIn(allScenarios()), scenarioName);
 INSTANTIATE_TEST_SUITE_P(Disk, DiskFaultTest, ::testing::ValuesIn(homeScenarios({"replace"})), scenarioName);
 // Those that have found faults of their own; each of the others takes as long for what these find too.
-INSTANTIATE_TEST_SUITE_P(Home, HomeFaultTest, ::testing::ValuesIn(homeScenarios({"replace", "recovery of a replace"})),
-                         scenarioName);
+INSTANTIATE_TEST_SUITE_P(
+    Home, HomeFaultTest,
+    ::testing::ValuesIn(homeScenarios({"replace", "replace without exchange", "recovery of a replace"})), scenarioName);
 
 void loopOverCuts(const Scenario& scenario, DiskModel model, Home home = Home::onRoot) {
     // Two file systems have the product of each one's states.
@@ -137,6 +139,7 @@ void loopOverCuts(const Scenario& scenario, DiskModel model, Home home = Home::o
     const fs::Durability::Probe probe = model == DiskModel::unordered ? noOrderAnywhere : journalEverywhere;
     platform::LinuxDisk linuxDisk;
     Device device("/dev/shm", home);
+    device.exchanges = scenario.exchanges;
     RecordingDisk disk(linuxDisk, device.root.path(), {"run"});
     // From the first launch on: what it makes is not synced by itself.
     disk.start();

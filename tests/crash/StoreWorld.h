@@ -4,6 +4,7 @@
 #pragma once
 
 #include "daemon/Daemon.h"
+#include "support/InterceptedDisk.h"
 #include "support/StoreJudge.h"
 #include "world/World.h"
 
@@ -94,6 +95,18 @@ struct LaterDaemon {
 /// Where private/var/mobile lies: on the root's file system, or on one mounted there.
 enum class Home { onRoot, mounted };
 
+/// A disk on whose file systems no two names can be exchanged.
+class WithoutExchange final : public InterceptedDisk {
+public:
+    using InterceptedDisk::InterceptedDisk;
+    int rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) override {
+        return flags == RENAME_EXCHANGE ? -EINVAL : inner().rename(fromDirectory, from, toDirectory, to, flags);
+    }
+
+private:
+    ssize_t intercept(const DiskCallInfo&, const Make& make) override { return make(); }
+};
+
 /// A device for one run of a fault loop: its root, and what its clients were promised.
 struct Device {
     explicit Device(const std::string& parent, Home whereHome = Home::onRoot) : root(parent), home(whereHome) {
@@ -110,8 +123,9 @@ struct Device {
     }
     /// Another daemon in the place of the one that there is, on that disk.
     void restart(platform::Disk& onDisk) {
-        daemon.reset();
-        daemon = std::make_unique<StoreDaemon>(root.path(), marker, onDisk, probe);
+        daemon.reset(); // it lives on the disk
+        platform::Disk& its = exchanges ? onDisk : withoutExchange.emplace(onDisk);
+        daemon = std::make_unique<StoreDaemon>(root.path(), marker, its, probe);
         daemon->launch();
     }
     /// Creates a container and notes it as promised. False when the daemon did not.
@@ -142,6 +156,9 @@ struct Device {
     std::vector<Acknowledged> promised;
     /// A change that promises no container was acknowledged.
     bool acted = false;
+    /// Before it starts: whether its file systems exchange names.
+    bool exchanges = true;
+    std::optional<WithoutExchange> withoutExchange;
     /// What the daemon runs on.
     platform::Disk* disk = nullptr;
     fs::Durability::Probe probe = journalEverywhere;

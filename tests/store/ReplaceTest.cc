@@ -1,10 +1,14 @@
 // SPDX-License-Identifier: Apache-2.0
 // Replace and wipe: what is swapped, what is refused, what each failing step leaves, and what a launch makes of each
 // state that a stop can leave.
+#include "fs/Names.h"
 #include "world/World.h"
 
+#include <atomic>
 #include <fcntl.h>
+#include <future>
 #include <gtest/gtest.h>
+#include <sys/mount.h>
 #include <tuple>
 
 namespace zor::test {
@@ -307,6 +311,116 @@ TEST(ReplaceAtHome, ChangesPlaces) {
             }
             EXPECT_TRUE(world.names(staging).empty() && world.names(journals).empty());
         }
+}
+
+// Goal: nobody waits under the lock of all identifiers for the disk, wherever the two lie and whatever their file
+// systems can, and the new content is there afterwards. Method: a table of places; at each call that waits, whether it
+// is held.
+TEST(ReplaceAnywhere, NothingWaitsUnderTheLock) {
+    if (!MountedHome::canBe())
+        GTEST_SKIP() << "skipped: only root may mount a home";
+    constexpr ContainerClass system = ContainerClass::dataSystem;
+    struct Row {
+        fs::Ordering ordering;
+        bool home;
+        bool exchanges;
+        bool oldIsTransient; // and the new one live
+        ContainerClass containerClass;
+        bool classIsMounted; // so that the new one lies elsewhere
+    };
+    const Row rows[] = {{fs::Ordering::journal, false, true, false, application, false},
+                        {fs::Ordering::none, false, true, false, application, false},
+                        {fs::Ordering::journal, true, true, false, application, false},
+                        {fs::Ordering::journal, true, false, false, application, false},
+                        {fs::Ordering::none, true, false, false, application, false},
+                        {fs::Ordering::none, true, true, true, application, false},
+                        {fs::Ordering::none, false, true, false, system, true},
+                        {fs::Ordering::journal, false, true, true, system, true}};
+    for (const Row& row : rows)
+        for (const Preserve preserve : {Preserve::no, Preserve::yes}) {
+            SCOPED_TRACE(std::to_string(&row - rows) + (preserve == Preserve::yes ? " preserving" : ""));
+            World world({.probe = row.ordering == fs::Ordering::none ? [](int) { return fs::Ordering::none; }
+                                                                     : [](int) { return fs::Ordering::journal; }});
+            std::optional<MountedHome> home;
+            ASSERT_TRUE(!row.home || home.emplace(world.path()).mounted());
+            const std::string mount = world.path("private/var/containers/Data/System");
+            if (row.classIsMounted) {
+                world.makeDirectories("private/var/containers/Data/System");
+                ASSERT_EQ(::mount("class", mount.c_str(), "tmpfs", 0, "mode=0755"), 0);
+            }
+            const FoundContainer old = world.make("id", row.containerClass, row.oldIsTransient);
+            const FoundContainer fresh = world.make("id", row.containerClass, !row.oldIsTransient);
+            world.write(world.relative(fresh.path) + "/content", "new");
+            const ZORLocks& locks = world.services().locks();
+            world.disk().before = [&, here = std::this_thread::get_id()](const DiskCallInfo& call) {
+                using enum DiskCall;
+                const bool waits = call.call == sync || call.call == syncFileSystem || call.call == orderData ||
+                                   call.call == write || call.call == createFile || call.call == copyData;
+                // Without an own identifier's lock it is that of all.
+                EXPECT_FALSE(waits && std::this_thread::get_id() == here && !locks.quietGeneration() &&
+                             locks.identifiersInUse() == 0)
+                    << call.describe();
+            };
+            world.disk().arm({.error = EINVAL, .filter = [&](const DiskCallInfo& call) {
+                                  return !row.exchanges &&
+                                         call.subject == nameOf(old.path) + " -> " + nameOf(fresh.path);
+                              }});
+            EXPECT_EQ(complaintOf(world.replace(&old, fresh, preserve)), "");
+            world.disk().disarm();
+            world.disk().before = nullptr;
+            EXPECT_EQ(world.pass(), ErrorCode::success);
+            for (int launch = 0; launch < 2; ++launch) {
+                const std::string identifier = "id";
+                const auto found = world.services().cache().containerForUser(
+                    ownerOf(row.containerClass), row.containerClass, &identifier, row.oldIsTransient);
+                ASSERT_TRUE(found) << found.error().text();
+                EXPECT_EQ((*found)->uuid(), preserve == Preserve::yes ? old.uuid : fresh.uuid);
+                EXPECT_EQ(world.read(world.relative((*found)->url().path()) + "/content"), "new");
+                EXPECT_FALSE(isThere(fresh.path) && fresh.path != (*found)->url().path());
+                world.relaunch();
+            }
+            EXPECT_TRUE(world.names(staging).empty() && world.names(journals).empty());
+            EXPECT_FALSE(world.exists(std::string("private/var/mobile/") + fs::deathRowOuter));
+            if (row.classIsMounted)
+                ::umount2(mount.c_str(), MNT_DETACH);
+        }
+}
+
+// Goal: whoever has to do with a container whose replace waits for the disk waits for that one, and nobody else does.
+// Method: on a file system without order, the sync between the two moves is held up; requests meanwhile.
+TEST_F(ReplaceWithoutOrder, OnlyWhoHasToDoWithItWaits) {
+    const FoundContainer old = make("id", false);
+    const FoundContainer fresh = make("id", asTransient);
+    std::promise<void> reached;
+    std::promise<void> goOn;
+    std::atomic<int> step = 0;
+    world.disk().before = [&, held = goOn.get_future().share()](const DiskCallInfo& call) {
+        if (call.call == DiskCall::rename && call.subject.starts_with(nameOf(old.path) + " -> "))
+            step = 1;
+        else if (int one = 1; isSync(call) && step.compare_exchange_strong(one, 2)) {
+            reached.set_value();
+            held.wait();
+        }
+    };
+    auto replaced = std::async(std::launch::async, [&] { return world.replace(&old, fresh); });
+    reached.get_future().wait();
+    std::future<ErrorCode> requests[] = {
+        std::async(std::launch::async, [&] { return codeOf(world.create("id")); }),
+        std::async(std::launch::async, [&] { return world.stage(fresh); }),
+        std::async(std::launch::async,
+                   [&] { return codeOf(world.daemonsClient().regenerateDirectoryUUIDForUser(addressOf(fresh))); }),
+    };
+    EXPECT_TRUE(world.create("another"));
+    for (auto& one : requests)
+        EXPECT_EQ(one.wait_for(std::chrono::milliseconds(50)), std::future_status::timeout);
+    goOn.set_value();
+    EXPECT_EQ(complaintOf(replaced.get()), "");
+    for (auto& one : requests)
+        EXPECT_TRUE(one.get() == ErrorCode::success || &one == &requests[2]); // renamed, or deleted before
+    world.disk().before = nullptr;
+    world.relaunch();
+    EXPECT_TRUE(isQuiet());
+    EXPECT_EQ(world.names(applications).size(), std::size_t{1} + (world.find("id") ? 1 : 0));
 }
 
 // Goal: a wipe keeps path and UUID and leaves a new one's content. Method: a table of clients and classes, a restart.
