@@ -120,6 +120,26 @@ if [[ -n "$first" ]]; then
     inside "systemd-analyze security --offline=true --threshold=$exposureMax zorvaned.service >/dev/null" || fail "the unit exposes more than it did"
 fi
 
+say "A service in a sandbox that says when it is ready"
+cat >"$root/etc/systemd/system/notes.service" <<'TEXT'
+[Unit]
+Requires=zorvaned.service
+After=zorvaned.service
+[Service]
+Type=notify
+WatchdogSec=1min
+ExecStart=/usr/sbin/zorvane-run --identifier org.example.notes --user 1000 -- /usr/bin/python3 -c "\
+import os, socket, time; \
+manager = socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM); \
+manager.sendto(('READY=1\\nSTATUS=at home in ' + os.getcwd()).encode(), os.environ['NOTIFY_SOCKET']); \
+time.sleep(60)"
+TEXT
+if [[ -n "$first" ]]; then
+    inside 'systemctl daemon-reload && systemctl start notes' || fail "the service did not say that it is ready"
+    [[ "$(inside 'systemctl show -P StatusText notes')" == "at home in /home/ann/Containers/"* ]] || fail "the service's state is not known"
+    inside 'systemctl stop notes && [[ "$(systemctl show -P Result notes)" == success ]]' || fail "the service did not end when it was told to"
+fi
+
 # The files of users, by name, owner and content.
 kept() {
     (cd "$root" && find home private/var/containers private/var/root/Library/Zorvane -type f -printf '%p %U %m\n' -exec sha256sum {} + | sort)

@@ -2,6 +2,7 @@
 // zorvane-run as a service manager uses it: a real daemon, real containers, real sandboxes. What makes sandboxes needs
 // root, and a kernel that allows namespaces here.
 #include "process/DaemonProcess.h"
+#include "support/Frames.h"
 #include "support/Waiting.h"
 #include "whole/Expect.h"
 
@@ -482,6 +483,53 @@ TEST(Run, AContainerSwappedAfterTheCheck) {
         EXPECT_EQ(outcome.output, "container") << swap;
         EXPECT_EQ(readFile(home + "/which"), "elsewhere") << "the swap took place";
     }
+}
+
+// Goal: a service manager hears of a program's state, from the launcher, and of nothing else. Method: a manager's
+// socket, with too little room for what a program says that names another process and leaves a descriptor.
+TEST(Run, TellsTheServiceManager) {
+    ZOR_NEEDS_SANDBOX();
+    Launcher launcher;
+    const std::string path = launcher.daemon.path("manager");
+    const platform::FileDescriptor manager(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+    const sockaddr_un address = support::addressOf(path);
+    ASSERT_EQ(::bind(manager.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    support::limitWaiting(manager.get());
+    const int yes = 1;
+    ASSERT_EQ(::setsockopt(manager.get(), SOL_SOCKET, SO_PASSCRED, &yes, sizeof yes), 0);
+    const char* const script = R"(
+import array, os, socket
+manager = socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM)
+manager.connect(os.environ["NOTIFY_SOCKET"])
+manager.sendmsg([b"MAINPID=1\nREADY=1\nFDSTORE=1\nSTATUS=" + os.environ["WATCHDOG_USEC"].encode()],
+                [(socket.SOL_SOCKET, socket.SCM_RIGHTS, array.array("i", [0]))])
+manager.send(b"BARRIER=1")
+for number in range(600): manager.send(b"STATUS=%d" % number)
+)";
+    Program program(launcher.words(notes, {"--", "python3", "-c", script}), [&] {
+        return ::setenv("NOTIFY_SOCKET", path.c_str(), 1) == 0 && ::setenv("WATCHDOG_USEC", "7", 1) == 0;
+    });
+    for (int number = -1; number < 600; ++number) {
+        char text[256];
+        alignas(cmsghdr) char control[CMSG_SPACE(sizeof(ucred))];
+        iovec part{.iov_base = text, .iov_len = sizeof text};
+        msghdr message{};
+        message.msg_iov = &part;
+        message.msg_iovlen = 1;
+        message.msg_control = control;
+        message.msg_controllen = sizeof control;
+        const ssize_t bytes = ::recvmsg(manager.get(), &message, 0);
+        ASSERT_GT(bytes, 0) << program.said();
+        const std::string expected = number < 0 ? "READY=1\nSTATUS=7\n" : "STATUS=" + std::to_string(number) + "\n";
+        ASSERT_EQ(std::string(text, static_cast<std::size_t>(bytes)), expected);
+        ucred sender{};
+        std::memcpy(&sender, CMSG_DATA(CMSG_FIRSTHDR(&message)), sizeof sender);
+        ASSERT_EQ(sender.pid, program.pid());
+        ASSERT_EQ(message.msg_flags & MSG_CTRUNC, 0);
+    }
+    EXPECT_EQ(program.wait(), 0) << program.said();
+    Program without(launcher.words(notes, {"--", "true"}), [] { return ::setenv("NOTIFY_SOCKET", "/x", 1) == 0; });
+    expectEnd(without, 125, "the service manager's socket /x cannot be reached");
 }
 
 // Goal: a directory to read is there, and only to read; the daemon's socket is such a one, so that a program can be a

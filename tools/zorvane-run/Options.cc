@@ -38,7 +38,8 @@ While the data protection of its files is being changed, a program is not starte
 The program finds HOME (its data container), TMPDIR (in it), ZORVANE_IDENTIFIER,
 ZORVANE_SYSTEM_CONTAINER (a path, where there is one), and ZORVANE_APP_GROUPS and
 ZORVANE_SYSTEM_GROUPS (a line for each: group, tab, path). Of the caller's environment
-it gets LANG, LANGUAGE, LC_*, TERM and TZ; use env(1) for more.
+it gets LANG, LANGUAGE, LC_*, TERM and TZ; use env(1) for more. What it tells the
+caller's NOTIFY_SOCKET of its own state is passed on.
 
 Examples:
   zorvane-run --identifier org.example.notes --user 501 -- /usr/bin/notes --new

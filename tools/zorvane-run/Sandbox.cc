@@ -43,7 +43,8 @@ bool isPassedOn(std::string_view variable) {
 } // namespace
 
 std::vector<std::string> sandboxArguments(const Options& options, const std::vector<Mount>& mounts,
-                                          const ToldContainers& told, InsideHandles handles) {
+                                          const ToldContainers& told, const Notifications& notifications,
+                                          InsideHandles handles) {
     std::vector<std::string> arguments = {
         options.bubblewrap, "--unshare-pid", "--unshare-ipc", "--unshare-uts", "--new-session", "--cap-drop", "ALL"};
     if (options.network == Network::none)
@@ -54,6 +55,8 @@ std::vector<std::string> sandboxArguments(const Options& options, const std::vec
     // The keys of all processes of the user, by name.
     if (::access(keysFile, F_OK) == 0)
         append(arguments, {"--ro-bind", "/dev/null", keysFile});
+    const std::vector<std::string> socket = notifications.arguments();
+    arguments.insert(arguments.end(), socket.begin(), socket.end());
     std::set<std::string> made = {"/proc", "/dev"};
     for (std::size_t i = 0; i < memoryPlaces.size(); ++i) {
         append(arguments, {"--bind", stagedMemoryPath(i), memoryPlaces[i]});

@@ -7,6 +7,7 @@
 #pragma once
 
 #include "Mounts.h"
+#include "Notifications.h"
 #include "Options.h"
 
 #include <string>
@@ -21,7 +22,8 @@ struct InsideHandles {
 };
 
 [[nodiscard]] std::vector<std::string> sandboxArguments(const Options& options, const std::vector<Mount>& mounts,
-                                                        const ToldContainers& told, InsideHandles handles);
+                                                        const ToldContainers& told, const Notifications& notifications,
+                                                        InsideHandles handles);
 /// "NAME=VALUE" each.
 [[nodiscard]] std::vector<std::string> sandboxEnvironment(const Options& options, const ToldContainers& told);
 

@@ -29,6 +29,10 @@ std::string stagedMemoryPath(std::size_t index) {
     return std::string(stagingDirectory) + "/memory" + std::to_string(index);
 }
 
+std::string stagedSocketPath() {
+    return std::string(stagingDirectory) + "/socket";
+}
+
 const char* stage(const std::vector<Mount>& mounts) {
     // Copies can be made only of what is mounted in the own namespace: first they, then the new one.
     std::vector<FileDescriptor> trees;

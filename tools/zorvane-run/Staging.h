@@ -21,6 +21,9 @@ inline constexpr std::array<const char*, 2> memoryPlaces = {"/dev/shm", "/tmp"};
 /// The place of the memory with this index, empty and bounded.
 [[nodiscard]] std::string stagedMemoryPath(std::size_t index);
 
+/// The place for a socket that the program is to find.
+[[nodiscard]] std::string stagedSocketPath();
+
 /// Moves this process into a mount namespace of its own, with everything that has a descriptor in its place there.
 /// nullptr, or the name of the call that failed (errno says why).
 [[nodiscard]] const char* stage(const std::vector<Mount>& mounts);

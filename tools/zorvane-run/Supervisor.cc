@@ -53,20 +53,24 @@ int exitCodeOf(int status) {
 /// The namespace's process 1 and, from when there is one, the program inside.
 class Supervisor {
 public:
-    Supervisor(pid_t keeper, FileDescriptor channel, FileDescriptor signals)
-        : keeper_(keeper), channel_(std::move(channel)), signals_(std::move(signals)) {}
+    Supervisor(pid_t keeper, FileDescriptor channel, FileDescriptor signals, Notifications notifications)
+        : keeper_(keeper), channel_(std::move(channel)), signals_(std::move(signals)),
+          notifications_(std::move(notifications)) {}
 
     /// Waits for the end. nullopt when the program never began.
     std::optional<int> wait() {
         for (;;) {
             pollfd events[] = {{.fd = signals_.get(), .events = POLLIN, .revents = 0},
-                               {.fd = channel_.get(), .events = POLLIN, .revents = 0}};
-            if (::poll(events, 2, -1) < 0 && errno != EINTR)
+                               {.fd = channel_.get(), .events = POLLIN, .revents = 0},
+                               notifications_.event()};
+            if (::poll(events, 3, -1) < 0 && errno != EINTR)
                 return end(SIGKILL);
             if (events[1].revents != 0)
                 takeProgram();
             if (events[0].revents != 0)
                 takeSignals();
+            if (events[2].revents != 0)
+                notifications_.pass();
             if (const auto status = ended())
                 return *status;
         }
@@ -118,6 +122,7 @@ private:
             takeProgram();
         if (!program_.valid())
             return std::optional<int>();
+        notifications_.passRest();
         return exitCodeOf(status);
     }
 
@@ -125,13 +130,17 @@ private:
     FileDescriptor channel_;
     FileDescriptor signals_;
     FileDescriptor program_;
+    Notifications notifications_;
     std::vector<int> early_;
 };
 
 /// In a child of process 1: becomes the maker of the sandbox. Never returns.
-[[noreturn]] void executeMaker(const std::vector<Mount>& mounts, InsideHandles handles, std::vector<char*>& arguments,
+[[noreturn]] void executeMaker(const std::vector<Mount>& mounts, InsideHandles handles,
+                               const Notifications& notifications, std::vector<char*>& arguments,
                                std::vector<char*>& environment) {
     const char* failed = stage(mounts);
+    if (!failed)
+        failed = notifications.appear();
     if (!failed && !(keepOnExec(handles.program) && keepOnExec(handles.channel)))
         failed = "fcntl";
     // The signals stay blocked; only that of children is the maker's own to wait for.
@@ -166,7 +175,8 @@ private:
 
 } // namespace
 
-Result<int> runSandboxed(const Options& options, const std::vector<Mount>& mounts, const ToldContainers& told) {
+Result<int> runSandboxed(const Options& options, const std::vector<Mount>& mounts, const ToldContainers& told,
+                         Notifications notifications) {
     const FileDescriptor program(::open("/proc/self/exe", O_PATH | O_CLOEXEC));
     if (!program.valid())
         return std::unexpected(failure("cannot open this program", zor::Errno::last()));
@@ -183,8 +193,10 @@ Result<int> runSandboxed(const Options& options, const std::vector<Mount>& mount
     if (!signals.valid() || ::sigprocmask(SIG_BLOCK, &caught, nullptr) != 0)
         return std::unexpected(failure("cannot catch signals", zor::Errno::last()));
     const InsideHandles handles{.program = program.get(), .channel = inner.get()};
-    std::vector<std::string> arguments = sandboxArguments(options, mounts, told, handles);
+    std::vector<std::string> arguments = sandboxArguments(options, mounts, told, notifications, handles);
     std::vector<std::string> environment = sandboxEnvironment(options, told);
+    const std::vector<std::string> more = notifications.environment();
+    environment.insert(environment.end(), more.begin(), more.end());
     std::vector<char*> argumentPointers = pointersTo(arguments);
     std::vector<char*> environmentPointers = pointersTo(environment);
     const FileDescriptor self(static_cast<int>(::syscall(SYS_pidfd_open, ::getpid(), 0)));
@@ -197,12 +209,13 @@ Result<int> runSandboxed(const Options& options, const std::vector<Mount>& mount
     if (keeper == 0) {
         const pid_t maker = ::fork();
         if (maker == 0)
-            executeMaker(mounts, handles, argumentPointers, environmentPointers);
+            executeMaker(mounts, handles, notifications, argumentPointers, environmentPointers);
         inner.reset();
         keep(self.get(), maker);
     }
     inner.reset(); // or the channel would never end
-    if (const auto exitCode = Supervisor(keeper, std::move(channel), std::move(signals)).wait())
+    if (const auto exitCode =
+            Supervisor(keeper, std::move(channel), std::move(signals), std::move(notifications)).wait())
         return *exitCode;
     return std::unexpected(Failure{
         .what = "the sandbox could not be made; " + options.bubblewrap + " or zorvane-run said why above",

@@ -12,11 +12,12 @@
 
 #include "Failure.h"
 #include "Mounts.h"
+#include "Notifications.h"
 
 namespace zorvanerun {
 
 /// The exit code of the program, or why it never began.
 [[nodiscard]] Result<int> runSandboxed(const Options& options, const std::vector<Mount>& mounts,
-                                       const ToldContainers& told);
+                                       const ToldContainers& told, Notifications notifications);
 
 } // namespace zorvanerun

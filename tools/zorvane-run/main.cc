@@ -7,6 +7,7 @@
 #include "Descriptors.h"
 #include "Inside.h"
 #include "Mounts.h"
+#include "Notifications.h"
 #include "Options.h"
 #include "Output.h"
 #include "Registered.h"
@@ -21,6 +22,7 @@
 #include <cstring>
 #include <malloc.h>
 #include <unistd.h>
+#include <utility>
 
 namespace {
 
@@ -52,11 +54,12 @@ Result<Prepared> prepare(const Root& root, const Options& options) {
 /// Looks for an assertion before anything is made, and again when all is: that may have taken minutes. Whoever waited
 /// then prepares anew, for the containers may be others by now.
 Result<int> start(const Root& root, const Options& options) {
+    Notifications notifications = TRY(Notifications::ofCaller());
     (void)TRY(awaitFreedom(root, options));
     for (;;) {
         const Prepared prepared = TRY(prepare(root, options));
         if (TRY(awaitFreedom(root, options)) == Freedom::found)
-            return runSandboxed(options, prepared.mounts, prepared.told);
+            return runSandboxed(options, prepared.mounts, prepared.told, std::move(notifications));
     }
 }
 
