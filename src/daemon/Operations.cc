@@ -19,7 +19,7 @@ Operations::Operations(const Store& store, const platform::Platform& platform)
       maker({store.log, store.fileManager, store.durability, store.configuration, whitelist, deathRow}),
       creation({store, store.configuration, entitlements, limits, moves, deathRow, recovery, maker}),
       removal({store, store.fileManager, store.configuration, moves, mappings, deathRow, recovery}),
-      groups({store, store.configuration, entitlements, creation, removal, setup}),
+      groups({store, store.configuration, entitlements, recovery, maker, creation, removal, setup}),
       entitlementChange({store, store.configuration, entitlements, removal, groups}),
       deletion({store, creation, removal, entitlementChange}),
       replace({store, store.fileManager, store.configuration, whitelist, moves, mappings, deathRow, recovery}),

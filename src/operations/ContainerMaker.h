@@ -24,6 +24,7 @@
 
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 
 namespace zor {
@@ -70,6 +71,30 @@ private:
     auto orCleanUp(const FileURL& staging, Step&& step) -> decltype(step());
 
     const Needs needs_;
+};
+
+/// A container that is built before the lock is taken, for who finds under it that there is none. One that nobody has
+/// taken goes to death row.
+class BuiltAhead {
+public:
+    explicit BuiltAhead(ContainerMaker& maker) : maker_(maker) {}
+    BuiltAhead(const BuiltAhead&) = delete;
+    BuiltAhead& operator=(const BuiltAhead&) = delete;
+    ~BuiltAhead() {
+        if (container)
+            maker_.discard(*container);
+    }
+
+    /// Errors as ContainerMaker::build has them.
+    Result<void> build(std::uint32_t userId, const std::string& identifier, ContainerClass containerClass) {
+        container = TRY(maker_.build(userId, identifier, containerClass));
+        return {};
+    }
+
+    std::optional<ContainerMaker::Built> container;
+
+private:
+    ContainerMaker& maker_;
 };
 
 } // namespace zor

@@ -19,22 +19,6 @@ FoundContainer snapshot(const std::shared_ptr<ZORMetadata>& record) {
     return {.record = record, .uuid = record->uuid(), .path = record->url().path(), .existed = record->existed()};
 }
 
-/// A container that was built and that nobody has needed goes to death row.
-class Unused {
-public:
-    explicit Unused(ContainerMaker& maker) : maker_(maker) {}
-    Unused(const Unused&) = delete;
-    Unused& operator=(const Unused&) = delete;
-    ~Unused() {
-        if (container)
-            maker_.discard(*container);
-    }
-    std::optional<ContainerMaker::Built> container;
-
-private:
-    ContainerMaker& maker_;
-};
-
 } // namespace
 
 Result<FoundContainer> Creation::createOrLookupContainerForUser(const Caller& caller, std::uint32_t userId,
@@ -50,11 +34,11 @@ Result<FoundContainer> Creation::createOrLookupContainerForUser(const Caller& ca
                     .record = live->record, .uuid = live->uuid, .path = std::move(live->path), .existed = true};
             }
         const Wanted wanted{caller, userId, *identifier, containerClass, options};
-        Unused built(needs_.maker);
-        auto found = TRY(lookedFor(wanted, &built.container));
+        BuiltAhead built(needs_.maker);
+        auto found = TRY(lookedFor(wanted, built.container));
         if (!found) {
-            built.container = TRY(needs_.maker.build(userId, *identifier, containerClass));
-            found = TRY(lookedFor(wanted, &built.container));
+            TRY(built.build(userId, *identifier, containerClass));
+            found = TRY(lookedFor(wanted, built.container));
         }
         TRY(makeDurable(*found));
         found->movedInto = nullptr;
@@ -62,14 +46,13 @@ Result<FoundContainer> Creation::createOrLookupContainerForUser(const Caller& ca
     });
 }
 
-Result<FoundContainer> Creation::createOrLookupContainerForUser(const Caller& caller, std::uint32_t userId,
-                                                                const std::string* identifier,
-                                                                ContainerClass containerClass,
-                                                                const CreateOrLookupOptions& options,
-                                                                const AllIdentifiersWriteLock& lock) {
-    return needs_.boundary.run({function, __LINE__}, [&]() -> Result<FoundContainer> {
+Result<std::optional<FoundContainer>>
+Creation::createOrLookupContainerForUser(const Caller& caller, std::uint32_t userId, const std::string* identifier,
+                                         ContainerClass containerClass, const CreateOrLookupOptions& options,
+                                         BuiltAhead& ahead, const AllIdentifiersWriteLock& lock) {
+    return needs_.boundary.run({function, __LINE__}, [&]() -> Result<std::optional<FoundContainer>> {
         TRY(checkRequest(caller, userId, identifier, containerClass));
-        return *TRY(createOrLookup({caller, userId, *identifier, containerClass, options}, nullptr, lock));
+        return createOrLookup({caller, userId, *identifier, containerClass, options}, ahead.container, lock);
     });
 }
 
@@ -94,7 +77,7 @@ Result<void> Creation::checkRequest(const Caller& caller, std::uint32_t userId, 
 }
 
 Result<std::optional<FoundContainer>> Creation::lookedFor(const Wanted& wanted,
-                                                          std::optional<ContainerMaker::Built>* built) {
+                                                          std::optional<ContainerMaker::Built>& built) {
     return needs_.recovery.undisturbed([&] {
         needs_.cache.prepare(wanted.userId, wanted.containerClass, wanted.options.transient);
         if (wanted.options.createIfNecessary && !wanted.caller.ownsRoot())
@@ -105,7 +88,7 @@ Result<std::optional<FoundContainer>> Creation::lookedFor(const Wanted& wanted,
 }
 
 Result<std::optional<FoundContainer>> Creation::createOrLookup(const Wanted& wanted,
-                                                               std::optional<ContainerMaker::Built>* built,
+                                                               std::optional<ContainerMaker::Built>& built,
                                                                const AllIdentifiersWriteLock& lock) {
     const auto& [caller, userId, identifier, containerClass, options] = wanted;
     UserHome* const home = isPerUserClass(containerClass) ? needs_.configuration.homeOf(userId) : nullptr;
@@ -113,7 +96,7 @@ Result<std::optional<FoundContainer>> Creation::createOrLookup(const Wanted& wan
     auto record = needs_.cache.containerForUser(userId, containerClass, &identifier, options.transient);
     const bool isNeeded = record ? options.transient : record.error().is(ErrorCode::notFound);
     // A replace that waits comes first, and might take what is being built in staging for what it waits for.
-    if (isNeeded && options.createIfNecessary && built && !*built && needs_.recovery.noneWaits()) {
+    if (isNeeded && options.createIfNecessary && !built && needs_.recovery.noneWaits()) {
         // A refusal must not cost the disk's time. The rest is asked when there is something to put in place.
         if (!record && !options.replacesAnother)
             TRY(checkShare(wanted));
@@ -175,11 +158,11 @@ Result<void> Creation::discardTransient(const ZORMetadata& record, const std::st
     return needs_.cache.removeContainerForUser(record.uid(), record.containerClass(), &identifier, true);
 }
 
-Result<FoundContainer> Creation::create(const Wanted& wanted, std::optional<ContainerMaker::Built>* built,
+Result<FoundContainer> Creation::create(const Wanted& wanted, std::optional<ContainerMaker::Built>& built,
                                         std::uint64_t homeGeneration) {
     const bool transient = wanted.options.transient;
-    ContainerMaker::Built mine = built && *built
-                                     ? *std::exchange(*built, std::nullopt)
+    ContainerMaker::Built mine = built
+                                     ? *std::exchange(built, std::nullopt)
                                      : TRY(needs_.maker.build(wanted.userId, wanted.identifier, wanted.containerClass));
     auto [live, classDirectory] = TRY(needs_.maker.putInPlace(mine, transient, homeGeneration));
     const auto& record = mine.record;

@@ -68,11 +68,12 @@ public:
                                                           const std::string* identifier, ContainerClass containerClass,
                                                           const CreateOrLookupOptions& options);
     /// The same for who holds that lock; makeDurable is called on the result when the lock is released, before anybody
-    /// is told.
-    Result<FoundContainer> createOrLookupContainerForUser(const Caller& caller, std::uint32_t userId,
-                                                          const std::string* identifier, ContainerClass containerClass,
-                                                          const CreateOrLookupOptions& options,
-                                                          const AllIdentifiersWriteLock& lock);
+    /// is told. Nothing: there is none, and `ahead` has to be built without the lock first. Also
+    /// ReplaceRecovery::metOneUnderWay.
+    Result<std::optional<FoundContainer>>
+    createOrLookupContainerForUser(const Caller& caller, std::uint32_t userId, const std::string* identifier,
+                                   ContainerClass containerClass, const CreateOrLookupOptions& options,
+                                   BuiltAhead& ahead, const AllIdentifiersWriteLock& lock);
     /// Returns at once for a container whose place is on the disk already. Error 8.
     Result<void> makeDurable(const FoundContainer& container);
 
@@ -87,17 +88,17 @@ private:
     Result<void> checkRequest(const Caller& caller, std::uint32_t userId, const std::string* identifier,
                               ContainerClass containerClass);
     /// createOrLookup under the lock. What that needs to know of this disk is read before it.
-    Result<std::optional<FoundContainer>> lookedFor(const Wanted& wanted, std::optional<ContainerMaker::Built>* built);
-    /// `built`: nullptr builds under the lock. Otherwise it is what the caller has built, or where it has nothing yet
-    /// the answer is nothing when it has to build first; what is used of it is taken.
+    Result<std::optional<FoundContainer>> lookedFor(const Wanted& wanted, std::optional<ContainerMaker::Built>& built);
+    /// `built` is what the caller has built; where it has nothing yet, the answer is nothing when it has to build
+    /// first. What is used of it is taken.
     Result<std::optional<FoundContainer>> createOrLookup(const Wanted& wanted,
-                                                         std::optional<ContainerMaker::Built>* built,
+                                                         std::optional<ContainerMaker::Built>& built,
                                                          const AllIdentifiersWriteLock& lock);
     /// Error 38 when the user of the container has as many as one may have.
     Result<void> checkShare(const Wanted& wanted);
     Result<void> discardTransient(const ZORMetadata& record, const std::string& identifier);
     /// `homeGeneration`: of the home in which the container was looked for and not found.
-    Result<FoundContainer> create(const Wanted& wanted, std::optional<ContainerMaker::Built>* built,
+    Result<FoundContainer> create(const Wanted& wanted, std::optional<ContainerMaker::Built>& built,
                                   std::uint64_t homeGeneration);
 
     const Needs needs_;

@@ -4,6 +4,9 @@
 #include "base/UserIdentity.h"
 
 #include <algorithm>
+#include <map>
+#include <set>
+#include <utility>
 
 namespace zor {
 
@@ -155,6 +158,52 @@ std::uint64_t ZORGroupManager::_cleanupUnreferencedGroupContainersForUser(std::u
     return removed;
 }
 
+Result<std::vector<FoundContainer>> ZORGroupManager::groupContainers(std::uint32_t userId, const Caller& caller,
+                                                                     const std::string& identifier, GroupType type,
+                                                                     const Failed& failed) {
+    std::map<std::string, BuiltAhead> ahead;
+    std::set<std::string> unavailable;
+    const auto isUnavailable = [&](const std::string& group, const ZORError& error) {
+        failed(error);
+        unavailable.insert(group);
+    };
+    std::vector<FoundContainer> containers;
+    std::vector<std::string> missing;
+    const auto look = [&]() -> Result<void> {
+        containers.clear();
+        missing.clear();
+        const AllIdentifiersWriteLock lock(needs_.locks);
+        const auto groups = type == GroupType::system
+                                ? needs_.entitlements.systemGroupIdentifiersForIdentifier(identifier)
+                                : needs_.entitlements.appGroupIdentifiersForIdentifier(identifier);
+        // Whoever may ask at all may ask for any identifier's: a path opens nothing, its directory has an owner.
+        for (const std::string& group : groups.value_or(std::vector<std::string>())) {
+            if (unavailable.contains(group))
+                continue;
+            auto found = needs_.creation.createOrLookupContainerForUser(
+                caller, userId, &group, classOf(type), {.createIfNecessary = true},
+                ahead.try_emplace(group, needs_.maker).first->second, lock);
+            if (!found && ReplaceRecovery::metOneUnderWay(found.error()))
+                return std::move(found).error();
+            if (!found)
+                isUnavailable(group, found.error());
+            else if (*found)
+                containers.push_back(std::move(**found));
+            else
+                missing.push_back(group);
+        }
+        return {};
+    };
+    for (;;) {
+        TRY(needs_.recovery.undisturbed(look));
+        if (missing.empty())
+            return containers;
+        for (const std::string& group : missing)
+            if (const auto built = ahead.at(group).build(userId, group, classOf(type)); !built)
+                isUnavailable(group, built.error());
+    }
+}
+
 Result<ZORGroupManager::Paths> ZORGroupManager::groupContainerPathsForUser(std::uint32_t userId, const Caller& caller,
                                                                            const std::string* identifier) {
     constexpr Here here{"groupContainerPathsForUser", __LINE__};
@@ -167,26 +216,11 @@ Result<ZORGroupManager::Paths> ZORGroupManager::groupContainerPathsForUser(std::
                              "Failed to create or lookup group container-userId: %u, ID: %s : %llu", userId,
                              ZOR_SHOWN(*identifier), static_cast<unsigned long long>(error.replyCode()));
         };
-        std::vector<FoundContainer> containers;
-        const bool system = userId == needs_.configuration.users().system;
-        needs_.cache.prepare(userId, classOf(system ? GroupType::system : GroupType::application), false);
-        {
-            const AllIdentifiersWriteLock lock(needs_.locks);
-            const auto groups = system ? needs_.entitlements.systemGroupIdentifiersForIdentifier(*identifier)
-                                       : needs_.entitlements.appGroupIdentifiersForIdentifier(*identifier);
-            // Whoever may ask at all may ask for any identifier's: a path opens nothing, its directory has an owner.
-            for (const std::string& group : groups.value_or(std::vector<std::string>())) {
-                auto found = needs_.creation.createOrLookupContainerForUser(
-                    caller, userId, &group, system ? ContainerClass::sharedSystemGroup : ContainerClass::sharedAppGroup,
-                    {.createIfNecessary = true, .transient = false}, lock);
-                if (found)
-                    containers.push_back(std::move(*found));
-                else
-                    groupFailed(found.error());
-            }
-        }
+        const GroupType type =
+            userId == needs_.configuration.users().system ? GroupType::system : GroupType::application;
+        needs_.cache.prepare(userId, classOf(type), false);
         Paths paths;
-        for (const FoundContainer& container : containers)
+        for (const FoundContainer& container : TRY(groupContainers(userId, caller, *identifier, type, groupFailed)))
             if (const auto synced = needs_.creation.makeDurable(container))
                 paths.emplace(container.record->identifier(), container.path);
             else

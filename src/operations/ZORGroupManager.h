@@ -9,9 +9,11 @@
 #include "base/ContainerClass.h"
 #include "base/ZORError.h"
 #include "operations/Caller.h"
+#include "operations/ContainerMaker.h"
 #include "operations/ContainerRemoval.h"
 #include "operations/Creation.h"
 #include "operations/RecordNeeds.h"
+#include "operations/ReplaceRecovery.h"
 #include "store/EntitlementFile.h"
 #include "store/SetupReport.h"
 #include "store/ZOREntitlementMapping.h"
@@ -31,6 +33,8 @@ public:
     struct Needs : RecordNeeds {
         ZORGlobalConfiguration& configuration;
         ZOREntitlementMapping& entitlements;
+        ReplaceRecovery& recovery;
+        ContainerMaker& maker;
         Creation& creation;
         ContainerRemoval& removal;
         SetupReport& report;
@@ -76,6 +80,12 @@ private:
                                                              const References& references);
     /// Says it where a container could not be staged; whether it was.
     bool isStaged(const char* function, std::uint32_t userId, const ZORMetadata& record, const Result<void>& staged);
+    using Failed = std::function<void(const ZORError&)>;
+    /// Those of the groups that the map has for the identifier, made where there is none. Each that there is none of is
+    /// told to `failed`.
+    Result<std::vector<FoundContainer>> groupContainers(std::uint32_t userId, const Caller& caller,
+                                                        const std::string& identifier, GroupType type,
+                                                        const Failed& failed);
     /// Every user that has groups of the type, and a home to have them in.
     void forEachUser(GroupType type, const std::function<void(std::uint32_t)>& function);
 

@@ -165,6 +165,11 @@ TEST(Syncs, AreWaitedForWithoutTheLock) {
         {"registration", [&](World& world) { return registers(world, Dictionary{{"k", 1}}); }},
         {"deletion of a bundle", [&](World& world) { return deletes(world, ContainerClass::bundleApplication); }},
         {"deletion", [&](World& world) { return deletes(world, application); }},
+        {"paths of groups",
+         [&](World& world) {
+             return world.services().groups().groupContainerPathsForUser(second, Caller::daemonItself(), &id)->size() ==
+                    1;
+         }},
     };
     for (const auto& [name, operation] : rows)
         for (const auto ordering : {fs::Ordering::journal, fs::Ordering::none}) {
