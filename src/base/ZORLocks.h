@@ -120,7 +120,8 @@ private:
     const std::string identifier_;
 };
 
-/// The same for writing. Who needs that lock held takes a reference to one: the proof that somebody holds it.
+/// The same for writing. A function that needs that lock held takes a reference to one: the proof that somebody holds
+/// it.
 class IdentifierWriteLock final : public IdentifierLock {
 public:
     IdentifierWriteLock(ZORLocks& locks, std::string identifier)

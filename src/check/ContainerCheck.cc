@@ -105,8 +105,8 @@ void ContainerCheck::checkPlacesOfMoves() {
     for (const MobileUser& user : look_.users())
         parents.push_back(StorePlaces::userTransientDirectory(user.home).deletingLastPathComponent());
     for (const FileURL& parent : parents) {
-        // What holds the old location may lie behind a link of the administrator's; where the others do, their classes
-        // say so.
+        // The parent of the old location may lie behind a link of the administrator's; where the others do, their
+        // classes say so.
         const auto directory = look_.device().fileManager().resolver().openDirectory(parent);
         if (directory)
             look_.forEachName(directory->get(), parent, [&](const char* name) { checkHidden(parent, name); });

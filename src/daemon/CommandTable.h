@@ -14,8 +14,8 @@
 
 namespace zor {
 
-/// What a handler works with. `request` and `reply` live as long as the call; a handler that replies later keeps
-/// `channel` and what it needs of the rest.
+/// The things that a handler works with. `request` and `reply` live as long as the call; a handler that replies later
+/// keeps `channel` and what it needs of the rest.
 struct CommandContext {
     const plist::Dictionary& request;
     plist::Dictionary& reply;

@@ -13,7 +13,7 @@ namespace powers = platform::entitlementKeys;
 
 namespace {
 
-/// What lines of the per-message handler are written under, whichever function writes them.
+/// The name under which lines of the per-message handler are written, whichever function writes them.
 constexpr const char* handlerName = "ZORProcessIpsiEvent";
 
 const std::string* identifierOf(const platform::Identity& identity) {

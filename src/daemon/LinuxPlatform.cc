@@ -71,7 +71,7 @@ LinuxPlatform::LinuxPlatform(SystemRoot root, DaemonLock lock, ipc::ConfiguredUs
       peers_(registry_, ::geteuid()), upcallPort_(root_, peers_, passed_.take(names::passedUpcallSocket)),
       listener_(peers_, listenerOptions(options.listenerLimits)),
       deathRowQueue_(deathRowLabel, WorkQueue::Priority::background), lockStateQueue_(lockStateLabel) {
-    // Where the loop cannot follow it, the registry looks for itself.
+    // The registry looks for itself where the loop cannot follow it.
     (void)registry_.follow(runLoop_);
 }
 

@@ -2,7 +2,7 @@
 // Every operation on the store, made once. A member may call those that stand above it, which it was given by
 // reference, and nothing else: the order of the members is the order of the house.
 //
-// Alive as long as the composition that made it. What is not an operation here is the data that several share.
+// Alive as long as the composition that made it. The members that are no operations are the data that several share.
 #pragma once
 
 #include "base/ZORException.h"

@@ -18,7 +18,7 @@
 
 namespace zor {
 
-/// Every operation takes its locks. Who holds one already calls the operation itself, and shows the lock.
+/// Every operation takes its locks. A caller that holds one already calls the operation itself, and shows the lock.
 enum class UseLocking : std::int32_t { yes = 1 };
 
 class ZORClientConnection {

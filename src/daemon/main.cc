@@ -107,7 +107,7 @@ private:
     std::atomic<bool> wanted_{false};
 };
 
-/// What only the platform's own objects count.
+/// The counters that only the platform's own objects keep.
 void addPlatformCounters(platform::LinuxPlatform& platform, plist::Dictionary& counters) {
     const platform::ListenerCounters listener = platform.listener().counters();
     counters.set("Connections", listener.connections);

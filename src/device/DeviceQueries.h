@@ -27,8 +27,8 @@ private:
     const SystemRoot& root_;
 };
 
-/// The value of `key` in text of the form of os-release: shell assignments, one a line, values perhaps quoted. Of
-/// several the last counts; empty when there is none.
+/// The value of `key` in text of the form of os-release: shell assignments, one a line, values perhaps quoted. The last
+/// of several counts; empty when there is none.
 [[nodiscard]] std::string valueInRelease(std::string_view text, std::string_view key);
 
 } // namespace zor::platform

@@ -4,7 +4,7 @@
 // No file is 0, unlocked. A file that holds no number is -1: neither locked nor unlocked, so nothing that waits for an
 // unlock starts, and nothing begins to wait for one that may never be said. It is -1 too when there is no descriptor or
 // no memory to look with; then the loop is told a moment later, as of a change, for nobody will change it again because
-// a notice was not understood. Where the system gives no notices (each user has so many of them) the loop is told four
+// a notice was not understood. If the system gives no notices (each user has so many of them), the loop is told four
 // times a second, and the notices are tried again each time.
 //
 // A change of protection class asks for every file, so the state that was read is kept: for a second at most, and only

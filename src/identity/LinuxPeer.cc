@@ -74,8 +74,9 @@ Identity LinuxPeer::identify(Explain explain) {
 
 ErrnoOr<LinuxPeer::Executable> LinuxPeer::executableOf(int process) {
     struct statx status{};
-    // The link is one of the kernel's: following it leads to the file that runs, whatever its name is or was. What
-    // tells it apart never changes, so a file system that a server keeps, maybe the peer's own, need not be asked.
+    // The link is one of the kernel's: following it leads to the file that runs, whatever its name is or was. The
+    // numbers that tell it apart never change, so a file system that a server keeps, maybe the peer's own, need not be
+    // asked.
     if (::statx(process, executableLink, AT_STATX_DONT_SYNC, STATX_INO | STATX_MODE | STATX_UID | STATX_GID, &status) !=
         0)
         return Errno::last();

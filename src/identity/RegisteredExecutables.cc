@@ -16,8 +16,8 @@ namespace {
 /// A file system that takes longer, and is not dead, makes its program unknown until it has answered.
 constexpr std::chrono::milliseconds patienceOfPeers{1000};
 
-/// The regular file that is open, or that lies at a path, whose last link is followed. What tells a file apart never
-/// changes, so its file system need not be asked for that.
+/// The regular file that is open, or that lies at a path, whose last link is followed. The numbers that tell a file
+/// apart never change, so its file system need not be asked for that.
 std::optional<FileId> regularFile(int directory, const char* path, int flags) {
     struct statx status{};
     if (::statx(directory, path, flags | AT_STATX_DONT_SYNC, STATX_INO | STATX_TYPE, &status) != 0 ||

@@ -9,8 +9,8 @@
 // Unlike a directory getter, a container is not there by halves: a mode or an owner that cannot be set fails the build.
 //
 // A stop leaves: while it is built, a directory in staging, which the next launch moves to death row; after the
-// move into the class directory, the container, whole. What a power cut leaves is the same: the metadata file's data is
-// on the disk before the move can be (fs/Durability.h).
+// move into the class directory, the container, whole. A power cut leaves the same: the metadata file's data is on the
+// disk before the move can be (fs/Durability.h).
 #pragma once
 
 #include "base/ContainerClass.h"

@@ -30,14 +30,14 @@
 
 namespace zor {
 
-/// A container as an operation found or made it. What a reply needs of the record was read while the operation still
-/// held its lock, so one client never sees what another's request made of the shared record meanwhile.
+/// A container as an operation found or made it. The parts of the record that a reply needs were read while the
+/// operation still held its lock, so one client never sees what another's request made of the shared record meanwhile.
 struct FoundContainer {
     std::shared_ptr<ZORMetadata> record;
     UUID uuid;
     std::string path;
     bool existed = false;
-    /// Of one that was just made: the directory that it was moved into.
+    /// The directory that a container which was just made was moved into.
     std::shared_ptr<const platform::FileDescriptor> movedInto = nullptr;
 };
 
@@ -87,10 +87,10 @@ private:
     };
     Result<void> checkRequest(const Caller& caller, std::uint32_t userId, const std::string* identifier,
                               ContainerClass containerClass);
-    /// createOrLookup under the lock. What that needs to know of this disk is read before it.
+    /// createOrLookup under the lock. The facts of this disk that the lookup needs are read before the lock is taken.
     Result<std::optional<FoundContainer>> lookedFor(const Wanted& wanted, std::optional<ContainerMaker::Built>& built);
     /// `built` is what the caller has built; where it has nothing yet, the answer is nothing when it has to build
-    /// first. What is used of it is taken.
+    /// first. The parts that are used are taken out of `built`.
     Result<std::optional<FoundContainer>> createOrLookup(const Wanted& wanted,
                                                          std::optional<ContainerMaker::Built>& built,
                                                          const AllIdentifiersWriteLock& lock);

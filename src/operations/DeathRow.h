@@ -2,7 +2,7 @@
 // Death row: where everything goes that is to be deleted.
 //
 // A move here is one rename on the caller's thread, usually under the locks of its operation; the item gets a name of
-// its own, so names never collide. What lies on another file system than root's death row goes to a death row there
+// its own, so names never collide. An item on another file system than root's death row goes to a death row there
 // (fs/FileSystemDeathRow.h): nothing is ever copied to get out of the way. Passes (DeletionPass.cc) delete it later, on
 // the death-row queue; what is on death row belongs to no container. A stop at any point leaves items, or empty
 // directories of theirs, for the next pass; the launch queues one.

@@ -3,9 +3,9 @@
 //
 // A container leaves with one move to death row (ContainerRemoval); the slow removal comes with a later pass. A live
 // bundle takes along what is registered for it (EntitlementChange), first: that is on the disk before the bundle moves,
-// so its deletion lets the lock go in between, and looks for the bundle again. What a stop leaves after that: the
-// bundle still there; deleting it again finds nothing more to drop. Elements of a batch are independent: a stop in the
-// middle has staged the first ones. Any thread.
+// so its deletion lets the lock go in between, and looks for the bundle again. A stop after that leaves the bundle
+// still there; deleting it again finds nothing more to drop. Elements of a batch are independent: a stop in the middle
+// has staged the first ones. Any thread.
 #pragma once
 
 #include "base/ContainerClass.h"
@@ -47,10 +47,10 @@ public:
     };
     explicit Deletion(const Needs& needs) : needs_(needs) {}
 
-    /// Takes the containers out of the store; their files go with the next deletion pass. What is not there is skipped,
-    /// what is malformed is logged and skipped. Takes the all-identifiers lock for writing, and syncs without it. Only
-    /// a live bundle's deletion releases what is registered for it. Errors 11 (lists that do not agree), and those of
-    /// ContainerRemoval.
+    /// Takes the containers out of the store; their files go with the next deletion pass. A container that is not there
+    /// is skipped, a malformed one is logged and skipped. Takes the all-identifiers lock for writing, and syncs without
+    /// it. Only a live bundle's deletion releases what is registered for it. Errors 11 (lists that do not agree), and
+    /// those of ContainerRemoval.
     Result<void> stageForDeleteContainersWithUsers(const DeletionBatch& batch);
     /// Stages the one container of an identifier. Errors as the lookup's and the staging's.
     Result<void> deleteContainerForUser(const Caller& caller, std::uint32_t userId, const std::string* identifier,

@@ -3,8 +3,8 @@
 // file system that holds containers.
 //
 // Passes run one after another on the death-row queue and take no lock. Items are taken as the directory is read, so no
-// number of them is too large for the memory, and none that fails keeps the others. What a power cut leaves is what was
-// on death row: nothing is removed whose move here could still be undone.
+// number of them is too large for the memory, and none that fails keeps the others. A power cut leaves what was on
+// death row: nothing is removed whose move here could still be undone.
 //
 // An item that cannot be removed goes to the directory for temporary files, as root's and closed, and marked, so that
 // later passes, of later daemons too, know it for theirs: only root can set such a mark, and names in that directory

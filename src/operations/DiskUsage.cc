@@ -23,7 +23,7 @@ std::optional<std::uint64_t> numberIn(const plist::Value& value) {
     return value.asUnsigned();
 }
 
-/// The size that an earlier measurement left. Who asks holds the lock of the record's container.
+/// The size that an earlier measurement left. The caller holds the lock of the record's container.
 std::optional<std::uint64_t> keptDiskUsage(const ZORMetadata& record) {
     const plist::Value* const value = record.info() ? record.info()->find(staticDiskUsageKey) : nullptr;
     return value ? numberIn(*value) : std::nullopt;

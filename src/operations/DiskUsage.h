@@ -1,10 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
-// How many bytes a container takes. What a live bundle takes is measured once and kept with its info, since its content
-// does not change; everything else is measured each time. A transient bundle is being filled.
+// How many bytes a container takes. The size of a live bundle is measured once and kept with its info, since its
+// content does not change; everything else is measured each time. A transient bundle is being filled.
 //
 // A bundle that is being filled is measured too, but not kept: nothing of what was walked may have changed within
-// settledTime before the walk, or in it. What is not seen: a fill that pauses for longer than that, and one that begins
-// during the walk in what was walked before, below the container's own directory.
+// settledTime before the walk, or in it. Two fills are not seen: one that pauses for longer than that, and one that
+// begins during the walk in what was walked before, below the container's own directory.
 //
 // The walk holds no lock: a lookup waits for every identifier lock, so a large container would stop all clients for as
 // long as it is walked. The container is looked up and opened under its lock, and walked on that descriptor; the result

@@ -32,7 +32,7 @@ bool isGroupOrNoString(const plist::Value& value) {
     return !text || ipc::isIdentifier(*text);
 }
 
-/// Why the groups of the entitlements are none that containers can be made for; nullptr when they are. What is of
+/// Why the groups of the entitlements are none that containers can be made for; nullptr when they are. A value of
 /// another type is judged where it is read.
 const char* whyGroupsAreUnusable(const plist::Dictionary* entitlements) {
     for (const std::string_view key :

@@ -37,7 +37,8 @@ public:
     Result<std::vector<ListedContainer>> containersForUser(std::uint32_t userId, ContainerClass containerClass,
                                                            bool transient);
     /// The same, limits.listPageMax at a time, in the order of the identifiers' bytes: those behind `after`, which is
-    /// empty for the first page. What is made or goes between two pages may be listed or not; all else is, once.
+    /// empty for the first page. A container that is made or goes between two pages may be listed or not; every other
+    /// is, once.
     Result<ListedPage> containersForUser(std::uint32_t userId, ContainerClass containerClass, bool transient,
                                          const std::string& after);
 

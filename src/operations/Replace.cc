@@ -27,7 +27,7 @@ std::string shown(const std::optional<UUID>& uuid) {
 } // namespace
 
 Result<void> Replace::replaceContainer(const ReplaceRequest& request, StartDeletionThread startDeletionThread) {
-    // What is thrown while containers move is dealt with where it happens; the rest has nothing to recover.
+    // An exception while containers move is dealt with where it happens; the rest has nothing to recover.
     return needs_.boundary.run({replaceFunction, __LINE__}, [&]() -> Result<void> {
         TRY(checkReplace(request));
         bool mayExchange = true;
@@ -75,7 +75,7 @@ Result<void> Replace::replaceOnce(const ReplaceRequest& request, Progress& progr
 
 Result<void> Replace::move(const ReplaceRequest& request, Progress& progress, StartDeletionThread startDeletionThread) {
     Result<void> result;
-    // What was prepared took its time: a home may have died meanwhile, and is not waited for under the lock.
+    // The preparation took its time: a home may have died meanwhile, and is not waited for under the lock.
     const auto askHome = [&] { (void)needs_.configuration.homeAnswers(request.userIdNew, fs::MountFence::Asked::now); };
     askHome();
     {
@@ -83,7 +83,7 @@ Result<void> Replace::move(const ReplaceRequest& request, Progress& progress, St
         result = recoveringFromExceptions(progress, [&] { return begin(request, progress, lock); });
         if (progress.stale)
             return {};
-        // What needs no sync in between others need not see half done.
+        // Others need not see a replace half done that needs no sync in between.
         if (!progress.isUnderWay) {
             if (auto failed = cleanUpReplace(progress, startDeletionThread))
                 result = std::move(*failed);

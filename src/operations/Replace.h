@@ -10,12 +10,12 @@
 //   6. what waits in staging goes to death row, then the journal       stopped: done; the journal goes
 //
 // Nothing waits for the disk under the all-identifiers lock. Steps 1 to 3 run before it (ReplacePreparation.cc), and
-// what they prepared counts when the containers are the same under it; else they come again. Where the file system
-// keeps no order by itself, the syncs between 4, 5 and 6 run without it, and the replace is known as under way: whoever
-// has to do with one of its containers waits for its end, and nobody else.
+// what they prepared counts when the containers are the same under it; else they come again. If the file system keeps
+// no order by itself, the syncs between 4, 5 and 6 run without it, and the replace is known as under way: whoever has
+// to do with one of its containers waits for its end, and nobody else.
 //
 // Nothing is copied to get out of the way, either: an old one on another file system than staging waits in a closed
-// directory of its own file system (fs/FileSystemDeathRow.h). Where there is a transient new one beside it, both change
+// directory of its own file system (fs/FileSystemDeathRow.h). If there is a transient new one beside it, both change
 // places in one step instead, which needs no journal:
 //   1. as above                                                        stopped: a transient one is discarded
 //   2. the two change places                                           stopped: done, under the old directory's name

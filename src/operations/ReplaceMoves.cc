@@ -285,8 +285,8 @@ std::optional<ZORError> Replace::cleanUpReplace(Progress& progress, StartDeletio
         waits();
         return std::nullopt;
     }
-    // The moves are on the disk before the journal can be gone. Where that cannot be, it stays for the next request or
-    // launch, which finds what has moved.
+    // The moves are on the disk before the journal can be gone. If that cannot be, the journal stays for the next
+    // request or launch, which finds what has moved.
     const int ordered = progress.moved ? needs_.moves.durability().between(progress.moved->get(), journals.get()) : 0;
     if (ordered < 0)
         return journalStays(posixError({replaceFunction, __LINE__}, -ordered, "sync of %s failed: %s",

@@ -84,7 +84,7 @@ Result<void> Replace::prepare(const ReplaceRequest& request, Prepared& prepared,
     const auto fresh = resolver.openParent(prepared.newUrl);
     const auto dest = resolver.openParent(prepared.destUrl);
     const auto staging = resolver.openDirectoryPath(needs_.configuration.stagingDirectory());
-    // Who opens them under the lock says what is wrong with these.
+    // The step that opens them again under the lock says what is wrong with these.
     if (!fresh || !dest || !staging || (prepared.oldRecord && !old)) {
         prepared.newRecord = nullptr;
         return {};

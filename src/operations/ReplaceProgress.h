@@ -11,8 +11,8 @@
 
 namespace zor {
 
-/// What was prepared without the lock, for the containers and places that were there then. Under the lock it counts
-/// only when these are the same.
+/// The results of the preparation without the lock, for the containers and places that were there then. Under the lock
+/// they count only when these are the same.
 struct Replace::Prepared {
     std::shared_ptr<ZORMetadata> oldRecord; // nullptr: none is replaced
     std::shared_ptr<ZORMetadata> newRecord; // nullptr: nothing could be prepared

@@ -16,7 +16,7 @@ namespace {
 
 constexpr const char* recoverFunction = "_recoverFromReplaceOperationsWithError";
 
-/// What lies in a place. What cannot be examined is unknown, and matches only where it does not matter.
+/// The content of a place. A place that cannot be examined is unknown, and matches only where it does not matter.
 enum class Found : std::uint8_t { absent, present, unknown };
 enum class Expected : std::uint8_t { absent, present, anything };
 enum class Recovery : std::uint8_t { nothing, moveOldBack };
@@ -27,11 +27,11 @@ struct State {
     Expected destination;
     Expected staging;
     Recovery recovery;
-    /// Where the last move led; nullptr: nothing lies anywhere.
+    /// The place where the last move led; nullptr: nothing lies anywhere.
     const FileURL ReplaceJournal::* settled;
     int logLevel;
 };
-/// The first row that matches holds. Where the new one is to take the old one's very place, that place counts as the
+/// The first row that matches holds. If the new one is to take the old one's very place, that place counts as the
 /// destination.
 constexpr State states[] = {
     {"nothing had moved", Expected::present, Expected::anything, Expected::anything, Recovery::nothing,
@@ -64,8 +64,8 @@ Found look(ZORFileManager& fileManager, const FileURL& url) {
     return fileManager.itemDoesNotExistAtURL(url) ? Found::absent : Found::unknown;
 }
 
-/// Of the old one in its waiting place. A closed directory that has gone tells nothing: perhaps its file system is not
-/// there yet.
+/// Whether the old one is in its waiting place. A closed directory that has gone tells nothing: perhaps its file system
+/// is not there yet.
 Found lookAside(ZORFileManager& fileManager, const ReplaceJournal& journal) {
     if (journal.asideUrl.empty())
         return look(fileManager, journal.stagingUrl);
@@ -189,7 +189,7 @@ Result<void> ReplaceRecovery::applyReplaceJournal(const ReplaceJournal& journal)
                          "Failed to recover replace move: %s to %s", journal.waitingUrl().c_str(),
                          journal.oldUrl.c_str());
     };
-    // What cannot be examined may be there or not. The journal waits for a launch that can tell.
+    // A place that cannot be examined may hold a container or not. The journal waits for a launch that can tell.
     const State* const state = stateOf(needs_.fileManager, journal);
     if (!state)
         return failed(nullptr);

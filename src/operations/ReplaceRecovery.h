@@ -3,8 +3,9 @@
 // that still wait afterwards (SettleReplaces.cc).
 //
 // A journal says where the directories of a replace were and were to go; which of them are there says how far it came.
-// Each recovery is one move at the most. A journal that cannot be settled or read stays and waits. What its state rests
-// on is on the disk before the journal can be gone: a stop in between leaves another state of the same table.
+// Each recovery is one move at the most. A journal that cannot be settled or read stays and waits. The moves that its
+// state rests on are on the disk before the journal can be gone: a stop in between leaves another state of the same
+// table.
 //
 // At a launch it runs on the thread that starts the daemon, before any client and before anything is cached; later
 // under the all-identifiers lock, for one journal.
@@ -56,8 +57,8 @@ public:
     /// Names in staging that journals on the disk still speak of; nullopt when it cannot be told which there are.
     [[nodiscard]] std::optional<std::set<std::string, std::less<>>> stagedByJournals();
     [[nodiscard]] std::size_t journalCount();
-    /// What lies aside on other file systems than staging's and no journal names goes to death row. How much went. At
-    /// the launch.
+    /// Items that lie aside on other file systems than staging's and that no journal names go to death row. Returns how
+    /// many went. At the launch.
     std::uint64_t sweepAside(const std::set<std::string, std::less<>>& kept);
 
     /// Whether no replace waits; costs one load.

@@ -77,7 +77,8 @@ Result<bool> ReplaceRecovery::settleReplaces(const ContainerAtStake& atStake, co
         if (!journal && ReplaceJournal::mayStillBeRead(journal.error()))
             return std::move(journal).error();
         const auto recovered = recoverReplace(one.journalUrl, journal ? &*journal : nullptr);
-        // What came back is not in it; also a try that failed may have brought it back, and only not rid the journal.
+        // The container that came back is not in the cache; also a try that failed may have brought it back, and only
+        // not rid the journal.
         needs_.cache.dropAll();
         TRY(recovered);
         // A replace that was done; one that was undone has left nothing there.

@@ -59,7 +59,7 @@ std::uint64_t Setup::migrateBundles() {
     if (!outcome.succeeded)
         needs_.log.write(logLevelError, rebootFunction, "Failed to migrate bundle containers to system location : %s",
                          outcome.error ? outcome.error->text().c_str() : "(null)");
-    // Where its moves hide what they copy: beside either location, and beside class directories.
+    // The places where the migrator's moves hide what they copy: beside either location, and beside class directories.
     needs_.orphans.discardCopyLeftovers(needs_.configuration.formerBundleDirectory().deletingLastPathComponent());
     needs_.orphans.discardCopyLeftovers(needs_.configuration.sharedContainersDirectory());
     needs_.orphans.discardCopyLeftovers(needs_.configuration.bundleDirectory());

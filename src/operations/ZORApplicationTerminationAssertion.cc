@@ -26,7 +26,8 @@ platform::TerminationReason reasonOf(const Log& log, std::uint8_t code) {
     }
 }
 
-/// What the service's answer is waited for with. It may come after the wait was given up, so both sides share it.
+/// The semaphore with which the service's answer is waited for. The answer may come after the wait was given up, so
+/// both sides share it.
 class Acquisition {
 public:
     Acquisition() : usable_(::sem_init(&semaphore_, 0, 0) == 0) {}

@@ -20,7 +20,7 @@ constexpr const char* whitelistFunction = "performWhitelistMigrationWithError";
 constexpr std::array bundleClasses = {ContainerClass::bundleApplication, ContainerClass::bundleKolvexPlugin,
                                       ContainerClass::bundleVPNPlugin, ContainerClass::bundleFramework};
 
-/// Of a listing: there is a link, or a file, on the way or in the directory's place.
+/// Whether a listing failed because a link, or a file, is on the way or in the directory's place.
 bool isMisshapen(const ZORError& error) {
     return error.isPosix(ELOOP) || error.isPosix(ENOTDIR);
 }
@@ -113,8 +113,8 @@ bool ZORContainerMigrator::mayHoldBundles(const FileURL& former) {
     }
     if (needs_.fileManager.itemExistsAtURL(former))
         return true;
-    // What cannot be examined counts as there: its move fails, no marker is written, and the next boot tries again. A
-    // link on the way is the doing of the user who owned the place, and would keep failing.
+    // A directory that cannot be examined counts as there: its move fails, no marker is written, and the next boot
+    // tries again. A link on the way is the doing of the user who owned the place, and would keep failing.
     struct stat status{};
     const int failure = needs_.fileManager.resolver().status(former, status);
     return failure != ENOENT && failure != ELOOP && failure != ENOTDIR;
@@ -153,7 +153,7 @@ Result<void> ZORContainerMigrator::moveEachFormerBundle(const FileURL& former) {
         if (isOfAnother(source))
             continue;
         const auto containers = needs_.fileManager.urlsForItemsInDirectoryAtURL(source);
-        // What the user put in a directory's place holds no containers; it goes with what is left.
+        // A link or file that the user put in a directory's place holds no containers; it goes with what is left.
         if (!containers && (containers.error().isPosix(ENOENT) || isMisshapen(containers.error())))
             continue;
         if (!containers) {
@@ -180,7 +180,7 @@ Result<void> ZORContainerMigrator::moveEachFormerBundle(const FileURL& former) {
                          former.c_str(), needs_.configuration.users().first);
         return {};
     }
-    // What is left are directories that held containers, and what never was one. It is in nobody's way.
+    // The rest is directories that held containers, and items that never were containers: in nobody's way.
     return needs_.deathRow._moveItemAtURLToDeathRow(former, StartDeletionThread::no);
 }
 

@@ -5,8 +5,9 @@
 //
 // No marker is written while something could not be read or written that the next boot may be able to.
 //
-// What a stop leaves: of the bundle migration, containers in either place, each whole, and no marker; the next boot
-// goes on where it stopped. Of the well-known one, containers under either name; the same. Takes no identifier locks.
+// A stop leaves, of the bundle migration, containers in either place, each whole, and no marker; the next boot goes on
+// where it stopped. A stop of the well-known one leaves containers under either name; the next boot goes on in the same
+// way. Takes no identifier locks.
 #pragma once
 
 #include "base/ContainerClass.h"

@@ -287,7 +287,7 @@ bool ZORDataProtectionChangeOperation::isShared(const struct stat& status) {
     // own anyway, and nothing else.
     if (status.st_uid == owner_)
         return status.st_nlink > 1 && !namesMet_.wasLast(status);
-    // The container's owner can move another's file in. What root put there with one name is the container's.
+    // The container's owner can move another's file in. A file that root put there with one name is the container's.
     if (status.st_nlink <= 1 && (status.st_uid == 0 || status.st_uid == ::geteuid()))
         return false;
     ++foreignFiles_;

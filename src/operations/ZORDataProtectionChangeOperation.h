@@ -32,7 +32,7 @@
 
 namespace zor {
 
-/// What a change does, as bits.
+/// The work of a change, as bits.
 namespace protectionChange {
 inline constexpr std::int32_t directories = 1;
 inline constexpr std::int32_t files = 2;
@@ -124,7 +124,7 @@ private:
     std::function<void(const IdentifierWriteLock&)> recordBlock_;
     CompletionBlock completionBlock_;
     std::optional<DirectoryIdentity> firstMet_;
-    // Of one pass.
+    // The state of one pass.
     uid_t owner_ = 0; // the container's
     fs::NamesMet namesMet_;
     std::uint64_t foreignFiles_ = 0; // of another owner than the container's

@@ -27,7 +27,7 @@ std::int32_t changeType(int current, int requested) {
 
 } // namespace
 
-/// What the blocks of one change share.
+/// The state that the blocks of one change share.
 struct ZORDataProtectionManager::Change {
     Change(ZORDataProtectionManager& itsManager, Request itsRequest, std::shared_ptr<const ZORMetadata> itsContainer,
            Completion itsCompletion)

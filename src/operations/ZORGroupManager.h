@@ -2,8 +2,8 @@
 // The containers that identifiers share: application groups, one container a user, and system groups.
 //
 // Nothing is counted ahead: how many identifiers refer to a group is worked out from the entitlement map when somebody
-// has to know. A container is made when a client first asks for its paths, and goes when the last reference goes. Where
-// the map is known to be incomplete nothing goes: a guess would delete what somebody still uses.
+// has to know. A container is made when a client first asks for its paths, and goes when the last reference goes. If
+// the map is known to be incomplete, nothing goes: a guess would delete what somebody still uses.
 #pragma once
 
 #include "base/ContainerClass.h"

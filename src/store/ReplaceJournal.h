@@ -26,7 +26,8 @@ struct ReplaceJournal {
     FileURL newUrl;     // the new one, before the replace
     FileURL stagingUrl; // where the old one waits
     FileURL destUrl;    // where the new one ends up
-    /// Where the old one waits when staging is on another file system: beside the death row of its own. Else empty.
+    /// The place where the old one waits when staging is on another file system: beside the death row of its own. Else
+    /// empty.
     FileURL asideUrl{};
 
     /// The place where the old one waits.
@@ -45,8 +46,8 @@ struct ReplaceJournal {
     /// Whether such a failed reading says nothing of the content: the file may be a good journal, and another time may
     /// tell.
     [[nodiscard]] static bool mayStillBeRead(const ZORError& readFailure);
-    /// The paths are absolute. Where the whole root was moved since the journal was written, they are made to lie below
-    /// it again: its old place is what precedes the staging directory's own path in `stagingUrl`.
+    /// The paths are absolute. If the whole root was moved since the journal was written, they are made to lie below it
+    /// again: its old place is what precedes the staging directory's own path in `stagingUrl`.
     void moveToRoot(const std::string& rootPath, const FileURL& stagingDirectory);
     /// For the log.
     [[nodiscard]] std::string text() const;

@@ -28,8 +28,8 @@ inline constexpr std::array<RootDirectory, 4> rootDirectories = {{
     {"tmp", 01777, false},
 }};
 
-/// Those of them, and the user database, that are not there. What cannot be looked at counts as there: the daemon says
-/// later what it failed on.
+/// Those of them, and the user database, that are not there. An entry that cannot be looked at counts as there: the
+/// daemon says later what it failed on.
 [[nodiscard]] std::vector<std::string> missingOf(const platform::SystemRoot& root);
 /// One line about them, with the command that makes them.
 [[nodiscard]] std::string lineAboutMissing(const platform::SystemRoot& root, const std::vector<std::string>& missing);

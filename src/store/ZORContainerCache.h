@@ -3,16 +3,16 @@
 //
 // Such a class cache is built from disk when it is first needed and kept; only adding and removing change it, and the
 // setup drops all of them once, before the first client. One of a user's is worth nothing when the user's home has
-// gone, come or become another one, and is built anew then. Where an encryption hides containers, those that are known
-// are found, and of no other is it said that it does not exist. The disk is the truth all the same: a lookup that
-// returns a record has just seen its metadata file. Where that has gone with its directory, the class directory is
-// looked over once for where the container may have been moved to. Code 21 is the one answer that means "does not
-// exist"; every other failure means "not known".
+// gone, come or become another one, and is built anew then. If an encryption hides containers, those that are known are
+// found, and of no other is it said that it does not exist. The disk is the truth all the same: a lookup that returns a
+// record has just seen its metadata file. If that file has gone with its directory, the class directory is looked over
+// once for where the container may have been moved to. Code 21 is the one answer that means "does not exist"; every
+// other failure means "not known".
 //
 // One mutex guards the class caches. Nobody waits for a disk on it: a class directory is read without it, by one thread
 // for all that need it, and what was read counts unless the class has changed meanwhile. The checks on disk run without
-// it, too. Who needs a lookup and a later add to be one step holds the identifier locks around both, and has the class
-// read before it takes them (prepare). Exceptions end at these operations (code 40).
+// it, too. A caller that needs a lookup and a later add to be one step holds the identifier locks around both, and has
+// the class read before it takes them (prepare). Exceptions end at these operations (code 40).
 #pragma once
 
 #include "base/ContainerClass.h"
@@ -88,8 +88,8 @@ public:
                                         const std::string* identifier, bool transient);
 
     /// Reads what a lookup will need, where that has not been done, and asks a home that may stop answering whether it
-    /// does. For who takes the all-identifiers lock next, so that nobody waits there for this disk. What fails is told
-    /// by the lookup, at once.
+    /// does. For who takes the all-identifiers lock next, so that nobody waits there for this disk. The lookup tells
+    /// the failure, at once.
     void prepare(std::uint32_t userId, ContainerClass containerClass, bool transient) ZOR_EXCLUDES(cacheLock_);
     /// The same for a lookup by UUID: of transient containers only where there may be some.
     void prepare(std::uint32_t userId, ContainerClass containerClass) ZOR_EXCLUDES(cacheLock_);

@@ -45,9 +45,9 @@ public:
     [[nodiscard]] UserHome* homeOf(std::uint32_t userId) const;
     /// Knows the homes of all mobile users, so that no way into one crosses a mount. A launch calls it before all else.
     void fenceHomes();
-    /// False when the file system of a mobile user's home does not answer, after `fs::homePatience` at the latest. Who
-    /// is about to take a lock that others need asks first; for a home on a local disk that costs nothing. True for
-    /// everybody else.
+    /// False when the file system of a mobile user's home does not answer, after `fs::homePatience` at the latest. A
+    /// caller that is about to take a lock that others need asks first; for a home on a local disk that costs nothing.
+    /// True for everybody else.
     [[nodiscard]] bool homeAnswers(std::uint32_t userId, fs::MountFence::Asked asked = fs::MountFence::Asked::lately);
 
     FileURL sharedContainersDirectory();

@@ -8,7 +8,7 @@
 //
 // A Client is one connection and is used by one thread at a time; programs that call from several threads make several.
 // Calls block until the answer is there or their time is over. After a transport error (any kind but daemon) the
-// connection is of no more use: connect again. What a caller may do is decided by the daemon's identity registry.
+// connection is of no more use: connect again. The daemon's identity registry decides what a caller may do.
 #pragma once
 
 #include "zorvane/Error.h"
@@ -109,7 +109,8 @@ public:
         std::string identifier;
         std::array<std::uint8_t, 16> uuid{};
     };
-    /// Takes containers out of the store; their files go when death row is emptied. What is not there is skipped.
+    /// Takes containers out of the store; their files go when death row is emptied. Containers that are not there are
+    /// skipped.
     [[nodiscard]] Result<void> stageForDelete(const std::vector<Address>& containers);
     /// The same for the one container of an identifier. Code 21: there is none.
     [[nodiscard]] Result<void> deleteContainer(std::uint64_t containerClass, std::uint32_t user,
@@ -150,8 +151,8 @@ public:
         std::int32_t protectionClass = 0;
         /// The container is not one of the system's own programs.
         bool thirdParty = false;
-        /// Where the device is locked, wait for its unlock and try again. The answer comes after that, so the call may
-        /// take as long as the device stays locked.
+        /// Wait for the unlock of a locked device, and try again. The answer comes after that, so the call may take as
+        /// long as the device stays locked.
         bool retryIfLocked = false;
     };
     /// Changes the data-protection class of a data container. Codes 38: a class that may not be asked for; 61: the

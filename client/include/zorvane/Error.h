@@ -18,13 +18,13 @@ struct Error {
         refused,
         /// The time given to the call ran out. The command may still be carried out.
         timedOut,
-        /// What came back makes no sense.
+        /// The answer makes no sense.
         protocol,
         /// The daemon answered with an error code.
         daemon,
     };
     Kind kind = Kind::protocol;
-    /// The daemon's code; 0 unless kind is daemon. Where a step failed that has no code of its own, the system's errno:
+    /// The daemon's code; 0 unless kind is daemon. For a failed step that has no code of its own, the system's errno:
     /// as it is where no code of the daemon's has that number, else with 1000 added.
     std::uint64_t code = 0;
     /// One sentence for people, without a full stop.
@@ -36,7 +36,7 @@ struct Error {
 /// The daemon found no such container, or no such info key in it.
 [[nodiscard]] bool isNotFound(const Error& error);
 
-/// What a code of the daemon means, how it comes about, what follows from it, and what to do. Static strings, never
+/// The meaning of a code of the daemon, how it comes about, what follows from it, and what to do. Static strings, never
 /// null or empty.
 struct ErrorText {
     const char* meaning;

@@ -414,8 +414,8 @@ private:
     std::unique_ptr<zorvane_client, Free> client_;
 };
 
-/// Calls that do not wait, for any event loop: watch fd(), and dispatch() when it is readable. What a callback throws,
-/// dispatch throws when it has called the others.
+/// Calls that do not wait, for any event loop: watch fd(), and dispatch() when it is readable. If a callback throws,
+/// dispatch throws the same when it has called the others.
 class Async {
 public:
     /// A failed call leaves the result empty, and the error is there.

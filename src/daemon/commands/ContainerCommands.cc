@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // Creating or finding a container, listing a class, emptying death row.
-// What is attached to one container: its info values and its record.
+// Reading and changing what is attached to one container: its info values and its record.
 // Changing the data-protection class of a container. It replies itself, when the change has ended.
 
 #include "daemon/commands/Commands.h"

@@ -41,7 +41,7 @@ namespace zor::commands {
     const auto resolved = context.users.validateUserId(static_cast<std::uint32_t>(requested), containerClass,
                                                        context.client->clientUserId());
     if (resolved && isPerUserClass(containerClass) && !context.operations.configuration.homeAnswers(*resolved)) {
-        // Before the request takes any lock. What would stop it there would stop everybody.
+        // Before the request takes any lock. A home that would stop it there would stop everybody.
         context.error = ErrorCode::cacheNotRebuilt;
         return std::nullopt;
     }
