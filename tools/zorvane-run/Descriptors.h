@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What is done with descriptors around an execution: judged, closed, kept, passed over a socket.
+// Descriptors around an execution: judged, closed, kept, passed over a socket.
 #pragma once
 
 #include "Options.h"

@@ -2,8 +2,8 @@
 // The part of this program that runs inside the sandbox: it becomes the user, gives up every power, and turns into the
 // program that was asked for.
 //
-// It is executed through a descriptor, since it lies nowhere in the sandbox. What it was given for its own use (the
-// sandbox's descriptors lead outside) is closed by the execution. The caller's keys, umask and ignored signals end
+// It is executed through a descriptor, since it lies nowhere in the sandbox. Descriptors for its own use (the
+// sandbox's lead outside) are closed by the execution. The caller's keys, umask and ignored signals end
 // here; its priority, limits and the like go on to the program: a service manager sets them for it. Whatever of this
 // does not work out ends it: the program never runs with more than its user may.
 #pragma once

@@ -19,7 +19,7 @@ using zor::platform::openBeneath;
 
 namespace {
 
-/// What is shown of the system, where it is there. Where /usr holds everything, most of these are links into it.
+/// Directories of the system that are shown if they exist. Most are links into /usr if that holds everything.
 constexpr const char* systemDirectories[] = {"/usr", "/bin", "/sbin", "/lib", "/lib32", "/lib64", "/libx32", "/etc"};
 /// Places that the sandbox fills itself.
 constexpr const char* ownDirectories[] = {"/proc", "/dev", "/tmp"};
@@ -36,7 +36,7 @@ Failure notFound(const std::string& cannot, const std::string& path, const std::
     constexpr const char* unit = "start this program where the directory is seen: of its unit, take away ProtectHome=, "
                                  "InaccessiblePaths=, TemporaryFileSystem= or RootDirectory= (the sandbox shows the "
                                  "program no more than is its own)";
-    // What process 1 sees is what is there for all; looking takes a power that the unit may lack.
+    // Process 1 sees what is there for all; a look at its root takes a power that the unit may lack.
     const FileDescriptor all(::open("/proc/1/root", O_PATH | O_DIRECTORY | O_CLOEXEC));
     if (!all.valid())
         return {.what = cannot + ". The daemon finds it: does the mount namespace of this process hide it",
@@ -46,7 +46,7 @@ Failure notFound(const std::string& cannot, const std::string& path, const std::
     return {.what = cannot, .advice = advice};
 }
 
-/// Of an absolute path below the root, where the relative one begins.
+/// The index in an absolute path below the root at which the relative path begins.
 std::size_t beginBelow(const Root& root) {
     return root.path == "/" ? 1 : root.path.size() + 1;
 }

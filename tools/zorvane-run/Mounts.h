@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the sandbox shows of the file system, each thing as an open descriptor.
+// The parts of the file system that the sandbox shows, each as an open descriptor.
 //
 // A container is opened from the root without following a link, and has to be a directory of its owner. From then on
 // the descriptor is what counts (Staging.h): whatever is put in its place afterwards is not mounted.

@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the program tells the service manager (NOTIFY_SOCKET): that it is ready, what it does, that it still lives.
+// The program's messages to the service manager (NOTIFY_SOCKET): that it is ready, what it does, that it still lives.
 //
 // The manager listens to the launcher, which is the unit's main process, and its socket is not in the sandbox. There
-// the program finds one of this object's. Of each message the lines that speak of the program's own state are sent on,
+// the program finds one of this object's. The lines of each message that speak of the program's own state are sent on,
 // and no descriptor: no other process can be named, nothing be left with the manager. A message that the manager does
 // not take yet is kept, and no other is read meanwhile: a program that tells too much waits, the launcher does not. One
 // thread; the process that makes the sandbox has a copy.
@@ -20,7 +20,8 @@ namespace zorvanerun {
 
 class Notifications {
 public:
-    /// Of the caller's environment; without NOTIFY_SOCKET the program finds nothing, and nothing is sent.
+    /// The notifications of the caller's environment; without NOTIFY_SOCKET the program finds nothing, and nothing is
+    /// sent.
     [[nodiscard]] static Result<Notifications> ofCaller();
 
     [[nodiscard]] bool areWanted() const { return manager_.valid(); }
@@ -31,7 +32,7 @@ public:
     /// In the process that makes the sandbox, when all is staged. nullptr, or the name of the call that failed.
     [[nodiscard]] const char* appear() const;
 
-    /// What pass() waits for; to be polled.
+    /// The event that pass() waits for; to be polled.
     [[nodiscard]] pollfd event() const;
     /// Sends on one message, if it can. False: nothing was there.
     bool pass();

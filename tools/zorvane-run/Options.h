@@ -41,7 +41,7 @@ struct Options {
     std::vector<std::string> command;
 };
 
-/// What is to be said instead of running, and the exit code for it: a whole text, or what is wrong.
+/// The words to say instead of running, and the exit code for them: a whole text, or what is wrong.
 struct OptionsEnd {
     std::string text;
     int exitCode = 0;

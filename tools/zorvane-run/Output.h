@@ -13,7 +13,7 @@ namespace zorvanerun {
 [[nodiscard]] int sayFailure(const Options& options, const Failure& failure);
 /// Whether all that was printed until now has reached standard output; says so where it has not.
 [[nodiscard]] bool outputReached();
-/// What would be mounted, with which environment, for which program.
+/// Shows what would be mounted, with which environment, for which program.
 [[nodiscard]] int showPlan(const Options& options, const std::vector<Mount>& mounts, const ToldContainers& told);
 
 } // namespace zorvanerun

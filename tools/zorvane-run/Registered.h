@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // Which containers a program gets: those that are registered for its identifier, or those of them that were named by
-// hand. What nothing registered refers to is never asked for: the next boot would delete it.
+// hand. Containers that nothing registered refers to are never asked for: the next boot would delete them.
 //
-// What is registered is learnt by asking as a peer without power over others: such a one is told exactly that. The
-// containers are made where they are missing.
+// This program learns what is registered by asking as a peer without power over others: such a peer is told exactly
+// that. The containers are made where they are missing.
 #pragma once
 
 #include "Failure.h"

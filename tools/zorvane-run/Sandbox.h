@@ -15,7 +15,7 @@
 
 namespace zorvanerun {
 
-/// What runs first inside: this program, through a descriptor, and a socket on which it reports.
+/// Handles for what runs first inside: this program, through a descriptor, and a socket on which it reports.
 struct InsideHandles {
     int program = -1;
     int channel = -1;

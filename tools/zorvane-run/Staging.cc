@@ -47,7 +47,7 @@ const char* stage(const std::vector<Mount>& mounts) {
     }
     if (::unshare(CLONE_NEWNS) != 0)
         return "unshare";
-    // What is mounted here stays here.
+    // Mounts that are made here stay here.
     if (::mount(nullptr, "/", nullptr, MS_REC | MS_SLAVE, nullptr) != 0)
         return "mount of / as a slave";
     if (::mount("tmpfs", stagingDirectory, "tmpfs", MS_NOSUID | MS_NODEV | MS_NOEXEC, "mode=0700") != 0)

@@ -17,7 +17,7 @@ using ipc::ContainerClass;
 
 namespace {
 
-// Where the daemon keeps containers: a user's below its home, the system's below the root.
+// The daemon keeps a user's containers below the user's home, the system's below the root.
 constexpr std::string_view userContainers = "/Containers/";
 constexpr std::string_view systemContainers = "/private/var/containers/";
 constexpr std::string_view temporaryName = "/tmp";

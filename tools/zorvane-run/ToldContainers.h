@@ -18,7 +18,7 @@
 
 namespace zorvanerun {
 
-/// What a process is to get besides its data container.
+/// The containers that a process is to get besides its data container.
 struct WantedContainers {
     std::set<std::string> applicationGroups;
     std::set<std::string> systemGroups;
@@ -39,7 +39,7 @@ struct ToldContainers {
 [[nodiscard]] std::vector<std::uint8_t> packRequest(const std::string& identifier, std::uint32_t user,
                                                     const WantedContainers& wanted);
 
-/// What a packed reply says, or in words why it is not believed. `root` is canonical.
+/// The containers that a packed reply tells, or in words why it is not believed. `root` is canonical.
 [[nodiscard]] std::expected<ToldContainers, std::string>
 readReply(zor::upcall::Bytes buffer, const WantedContainers& wanted, const std::string& root);
 

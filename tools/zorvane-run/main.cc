@@ -2,7 +2,7 @@
 // zorvane-run: runs a program as a user in a sandbox that holds the containers of its identifier. A device's service
 // manager calls it as root.
 //
-// What a kill leaves: the containers that were made so far, each whole; the sandbox ends with this process.
+// A kill leaves the containers that were made so far, each whole; the sandbox ends with this process.
 #include "Assertion.h"
 #include "Descriptors.h"
 #include "Inside.h"
@@ -28,14 +28,14 @@ namespace {
 
 using namespace zorvanerun;
 
-/// What the environment's lists, one line for each, could not tell apart.
+/// Names with control characters could not be told apart in the environment's lists, one line for each.
 bool hasControlCharacters(const WantedContainers& wanted, const std::string& identifier) {
     const auto isPlain = [](const std::string& text) { return printable(text) == text; };
     return !isPlain(identifier) || !std::ranges::all_of(wanted.applicationGroups, isPlain) ||
            !std::ranges::all_of(wanted.systemGroups, isPlain);
 }
 
-/// What the sandbox is made from.
+/// The things that the sandbox is made from.
 struct Prepared {
     ToldContainers told;
     std::vector<Mount> mounts;

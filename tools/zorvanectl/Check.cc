@@ -155,8 +155,8 @@ zorvane::Result<void> carryOut(zorvane::Client& client, const RepairStep& step) 
                                             .uuid = step.uuid.bytes()});
 }
 
-/// Shows each step, and does it unless it is only to be shown. What failed is said on standard error; its exit code is
-/// kept.
+/// Shows each step, and does it unless it is only to be shown. A step that failed is said on standard error; its exit
+/// code is kept.
 class Repair {
 public:
     Repair(const zorvane::ConnectOptions& connect, const Output& output, bool dryRun)

@@ -56,7 +56,7 @@ std::string checkClass(const std::string& text) {
     return "'" + text + "' " + noSuchClass + suggestion(text, known);
 }
 
-/// Where nothing is named on purpose, the word is left out: an empty one is a variable that a script forgot to set.
+/// A word that names nothing on purpose is left out: an empty one is a variable that a script forgot to set.
 std::string checkName(const std::string& text) {
     return text.empty() ? "it is empty" : "";
 }
@@ -104,7 +104,7 @@ Consent consentOf(const Arguments& arguments) {
     return arguments.yes ? Consent::given : Consent::ask;
 }
 
-/// What can only be told once all options are known. Nothing, or the exit code.
+/// Fills in what can only be told once all options are known. Nothing, or the exit code.
 std::optional<int> finishTarget(Arguments& arguments, const Output& output) {
     arguments.target.root = arguments.connect.root;
     arguments.target.containerClass = zorvane::containerClassOf(arguments.className).value_or(0);

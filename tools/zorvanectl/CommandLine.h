@@ -31,7 +31,7 @@ struct Arguments {
     Protection protection;
     std::optional<int> lockState;
     std::string code;
-    /// Of a file of the registry, or of an executable.
+    /// The path of a file of the registry, or of an executable.
     std::string path;
     Checking checking;
     InstallOptions install;
@@ -42,7 +42,7 @@ struct Arguments {
     std::vector<std::string> commands;
 };
 
-/// What the command line asks for, to be done once it is parsed as a whole.
+/// The action that the command line asks for, to be done once the line is parsed as a whole.
 using Action = std::function<int(const Output&)>;
 
 inline constexpr const char* jsonOption = "--json";

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// Where a command line that is not finished, or not right, has come to in the description of the commands. Pure
+// The place in the description of the commands that a command line, not finished or not right, has come to. Pure
 // functions.
 #pragma once
 
@@ -22,7 +22,7 @@ struct Place {
     bool optionsHaveEnded = false;
     /// The options that were given, by their long names without dashes.
     std::map<std::string, std::string> values;
-    /// What is wrong with the first word that is known nowhere, with the nearest one that is.
+    /// The mistake in the first word that is known nowhere, with the nearest one that is.
     std::optional<std::string> mistake;
 };
 [[nodiscard]] Place placeAfter(const CLI::App& app, std::span<const std::string> words);

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the tool's commands do, each with its options and its exit code.
+// The actions of the tool's commands, each with its options and its exit code.
 #pragma once
 
 #include "Output.h"
@@ -142,7 +142,7 @@ int groups(const zorvane::ConnectOptions& connect, const Output& output, std::ui
 int systemPath(const zorvane::ConnectOptions& connect, const Output& output, const std::string& identifier);
 int systemGroupPath(const zorvane::ConnectOptions& connect, const Output& output, const std::string& group,
                     const std::string& identifier);
-/// Who holds the groups of an identifier, and what goes when it goes.
+/// The holders of an identifier's groups, and what goes when the identifier goes.
 int why(const zorvane::ConnectOptions& connect, const Output& output, const std::string& identifier);
 /// The holders of a group, application's or system's.
 int whyGroup(const zorvane::ConnectOptions& connect, const Output& output, const std::string& group);

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What a shell may put in the place of the word that is being typed.
+// The words that a shell may put in the place of the one that is being typed.
 #pragma once
 
 #include <CLI/CLI.hpp>

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What a code means and what to do about it. Asks nobody: it works without a daemon.
+// The meaning of a code and what to do about it. Asks nobody: the command works without a daemon.
 #include "Explain.h"
 
 #include "Commands.h"
@@ -16,7 +16,7 @@ namespace zorvanectl {
 
 namespace {
 
-/// What both kinds of code have.
+/// The parts that both kinds of code have.
 struct Page {
     /// A number for the daemon's codes, a word for a check's.
     nlohmann::json code;

@@ -4,7 +4,7 @@
 //
 // Until that replace the live container is not touched, and the replace puts it away only when the new one takes its
 // place. So whatever fails (a signal, a full disk, a broken archive, a daemon that went away), the old one stays as it
-// was. The transient one is deleted then. Where that cannot be, after a kill of this program or with the daemon gone,
+// was. The transient one is deleted then. If that cannot be, after a kill of this program or with the daemon gone,
 // it lies there until it is asked for again, which the next installation does, until somebody deletes the identifier's
 // transient container (zorvanectl delete --transient), or until the first launch after a boot sweeps it.
 //
@@ -42,7 +42,7 @@ void keepSignals() {
     keep.sa_flags = static_cast<int>(SA_RESETHAND); // and not SA_RESTART: a read that waits is to end
     for (const int signal : {SIGINT, SIGTERM, SIGHUP}) {
         struct sigaction before{};
-        // What was ignored when this program began, as under nohup, stays so.
+        // Signals that were ignored when this program began, as under nohup, stay so.
         if (::sigaction(signal, nullptr, &before) == 0 && before.sa_handler != SIG_IGN)
             ::sigaction(signal, &keep, nullptr);
     }
@@ -79,7 +79,7 @@ private:
     int done(Client& client);
     /// `advice`: what to do, where it is not to try again.
     int failed(const std::string& message, const char* advice = "");
-    /// What became of the transient container, for the end of a message.
+    /// The fate of the transient container, for the end of a message.
     std::string discard();
 
     const zorvane::ConnectOptions& connect_;

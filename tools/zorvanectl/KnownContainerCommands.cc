@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What is done with a container that is there: replacing, wiping, repairing, measuring it, and its info values.
+// The commands for a container that is there: replacing, wiping, repairing, measuring it, and its info values.
 #include "Commands.h"
 #include "KnownContainer.h"
 #include "LostRecord.h"

@@ -55,7 +55,7 @@ public:
     void table(const std::vector<std::string>& header, const std::vector<std::vector<std::string>>& rows) const;
     /// A name and what is under it, a line each, deeper ones indented.
     void tree(const std::string& name, const zorvane::Value& value, const std::string& indent = "") const;
-    /// Asks on the terminal whether to go on. Where there is none, or for JSON, no: said as an error.
+    /// Asks on the terminal whether to go on. Without a terminal, or for JSON, no: said as an error.
     [[nodiscard]] bool agreed(const std::string& question, const std::string& while_) const;
     /// Says what failed, what that means and what to do. The exit code for it.
     [[nodiscard]] int error(const zorvane::Error& error, const std::string& while_) const;

@@ -47,7 +47,7 @@ std::string classOnDisk(int directory) {
     return std::to_string(defaultProtectionClass);
 }
 
-/// Of each directory that lies in the container.
+/// The class of each directory that lies in the container.
 content::Outcome<std::map<std::string, std::string>> classesOnDisk(const std::string& path, std::uint64_t kind) {
     FileDescriptor container = TRY(content::openToldContainer(path, fenceKind(kind)));
     std::map<std::string, std::string> classes;

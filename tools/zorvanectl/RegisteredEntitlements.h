@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the daemon tells the owner of its root about registered entitlements.
+// The registered entitlements, as the daemon tells them to the owner of its root.
 #pragma once
 
 #include "zorvane/Client.h"
@@ -39,7 +39,7 @@ public:
 
     struct Group {
         std::string identifier;
-        /// Who lists it, once for each time.
+        /// The identifiers that list the group, once for each time.
         std::vector<std::string> holders;
     };
     enum class GroupKind { application, system };

@@ -34,7 +34,7 @@ bool knowsTerminal() {
     // Quit where all fits, show colours, leave the text on the terminal, go on after an interrupt.
     (void)::setenv("LESS", "FRXMK", 0);
     (void)::setenv("LESSCHARSET", "utf-8", 0);
-    // Who may only look, and became root for that, gets no shell.
+    // A user who may only look, and became root for that, gets no shell.
     if (::geteuid() == 0)
         (void)::setenv("LESSSECURE", "1", 1);
     if (isSet("PAGER"))

@@ -19,7 +19,7 @@ public:
     [[nodiscard]] std::size_t columns() const { return columns_; }
     [[nodiscard]] bool isColoured() const { return isColoured_; }
     void leavePlain() { mayPage_ = false; }
-    /// What is written from here on may be long.
+    /// The text that is written from here on may be long.
     void page();
     [[nodiscard]] bool isPaged() const { return pager_ > 0; }
     /// When all is written.

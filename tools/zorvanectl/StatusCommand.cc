@@ -80,7 +80,7 @@ std::string jsonKey(const std::string& key) {
     return made;
 }
 
-/// What is registered has keys of others, which stay as they are.
+/// Registered entitlements have keys of others, which stay as they are.
 nlohmann::json withOwnKeys(const nlohmann::json& value) {
     if (value.is_array()) {
         nlohmann::json array = nlohmann::json::array();

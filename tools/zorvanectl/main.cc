@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// zorvanectl: the command line of the container manager. What it asks of the daemon goes through
-// the public client library.
+// zorvanectl: the command line of the container manager. Its requests to the daemon go through the public client
+// library.
 #include "CommandLine.h"
 #include "CommandWalk.h"
 #include "Completion.h"

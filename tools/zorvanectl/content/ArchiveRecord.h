@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the process that decodes an archive sends to the one that writes: entries, each followed by pieces of its data,
-// and at last an end or a failure. Both are this program; still the reader trusts none of it, since the sender has read
-// hostile bytes with a large library.
+// The records that the process that decodes an archive sends to the one that writes: entries, each followed by pieces
+// of its data, and at last an end or a failure. Both are this program; still the reader trusts no record, since the
+// sender has read hostile bytes with a large library.
 #pragma once
 
 #include <cstddef>
@@ -20,7 +20,7 @@ enum class RecordKind : std::uint32_t {
 inline constexpr std::uint32_t recordHardLink = 1; ///< the target is a hard link's
 inline constexpr std::uint32_t recordHasTime = 2;
 inline constexpr std::uint32_t recordHasSize = 4;
-// Of the end.
+// The flag of the end.
 inline constexpr std::uint32_t recordUncompressedTar = 1;
 
 struct Record {
@@ -32,13 +32,13 @@ struct Record {
     std::uint32_t mode = 0;
     std::uint32_t timeNanoseconds = 0;
     std::int64_t timeSeconds = 0;
-    /// Of an entry, its size; of data, where it begins.
+    /// The size of an entry; for data, the offset at which it begins.
     std::int64_t offset = 0;
-    /// Of the archive, read so far.
+    /// The bytes of the archive that were read so far.
     std::uint64_t readBytes = 0;
 };
 
-/// Of what follows a record.
+/// The most bytes that follow a record.
 inline constexpr std::size_t recordBytesMax = 256 * 1024;
 
 } // namespace zorvanectl::content

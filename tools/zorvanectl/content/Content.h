@@ -2,7 +2,7 @@
 // Puts an archive, or what is in a directory, into a new container.
 //
 // All of it is put together in a hidden directory that nobody else can reach (SealedDirectory.h), moved up when it is
-// whole, and synced. What the container has besides, its standard subdirectories, stays unless the content has the same
+// whole, and synced. The rest of the container, its standard subdirectories, stays unless the content has the same
 // name. A failure, or a stop at any point, leaves a container that is good for nothing but being thrown away.
 //
 // The source may belong to somebody hostile and change meanwhile; the container's owner may change the container. One
@@ -51,7 +51,7 @@ struct Observer {
     bool wantsShare = false;
 };
 
-/// `container` is open for reading. What came in; the content is on the disk then.
+/// `container` is open for reading. Returns what came in; the content is on the disk then.
 [[nodiscard]] Outcome<Progress> putContent(zor::platform::Disk& disk, int container, const Source& source,
                                            const Observer& observer, const volatile std::sig_atomic_t& stop);
 

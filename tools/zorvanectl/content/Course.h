@@ -15,9 +15,9 @@ namespace zorvanectl::content {
 
 struct Progress {
     std::uint64_t items = 0;
-    /// Of files, as written.
+    /// The bytes of files, as written.
     std::uint64_t bytes = 0;
-    /// Of what the source holds, 0 to 1.
+    /// The share of what the source holds, 0 to 1.
     double share = 0;
 };
 
@@ -36,7 +36,7 @@ public:
     [[nodiscard]] bool stopped() const { return stop_ != 0; }
     [[nodiscard]] Outcome<void> checkStopped() const;
 
-    /// What the source holds is `bytes` long; without it the share stays 0.
+    /// The source's content is `bytes` long; without this call the share stays 0.
     void expectBytes(std::uint64_t bytes) { expectedBytes_ = bytes; }
     /// So much of it has been read, where that is not what was written.
     void readTo(std::uint64_t bytes) { readBytes_ = bytes; }

@@ -23,9 +23,9 @@ public:
     GzipInput(const GzipInput&) = delete;
     GzipInput& operator=(const GzipInput&) = delete;
 
-    /// The next bytes, good until the next call; none at the end. What is wrong else.
+    /// The next bytes, good until the next call; none at the end. The error says what is wrong.
     [[nodiscard]] std::expected<std::span<const std::uint8_t>, const char*> next();
-    /// Of the file.
+    /// The bytes of the file that were read so far.
     [[nodiscard]] std::uint64_t readBytes() const { return readBytes_; }
 
 private:

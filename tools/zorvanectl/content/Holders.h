@@ -4,7 +4,7 @@
 // Whoever owns a directory can move into it, or link there, what belongs to others and is closed to him; an
 // installation reads as root and gives what it read away. So each item is judged against all the owners of directories
 // on the way to it: it has to belong to them, or be readable for everybody. Root and whoever runs the program are no
-// such owners. Where everybody may write, anybody may have put it there; into a sticky directory nobody moves what is
+// such owners. Anybody may have put an item where everybody may write; into a sticky directory nobody moves what is
 // another's, but a link can be made. Judged is what was opened, never a name. One thread.
 #pragma once
 

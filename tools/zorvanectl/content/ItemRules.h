@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What may come into a container, and under which name: the same for archives and directories.
+// The rules for what may come into a container, and under which name: the same for archives and directories.
 //
 // Files, directories, and symbolic links that stay inside. Refused are devices, FIFOs and sockets, set-user-ID and
 // set-group-ID bits of files, names that lead out, and the name of the container's own metadata file. One item that is
@@ -37,7 +37,7 @@ struct Item {
     std::string_view name;
     /// Type and permissions.
     mode_t mode = 0;
-    /// Of a symbolic link.
+    /// The target of a symbolic link.
     std::string_view linkTarget{};
 };
 

@@ -15,7 +15,7 @@ namespace zorvanectl::content {
 namespace {
 
 constexpr uid_t nobody = 65534;
-/// What a decoder may allocate: the greatest dictionaries in use take a tenth of it.
+/// The memory that a decoder may allocate: the greatest dictionaries in use take a tenth of it.
 constexpr rlim_t memoryBytesMax = rlim_t{1} << 30;
 
 #if defined(__has_feature)
@@ -29,8 +29,8 @@ constexpr bool limitsMemory = false; // a sanitizer has taken more address space
 constexpr bool limitsMemory = true;
 #endif
 
-/// What memory, time and open descriptors need; the most frequent first. One takes a name, which it only looks at: with
-/// it the C library asks about descriptors. AddressSanitizer asks for the signal stack.
+/// Calls that memory, time and open descriptors need; the most frequent first. One takes a name, which it only looks
+/// at: with it the C library asks about descriptors. AddressSanitizer asks for the signal stack.
 constexpr int callsLeft[] = {SYS_read,    SYS_write,        SYS_lseek,       SYS_pread64,   SYS_newfstatat,
                              SYS_fstat,   SYS_mmap,         SYS_munmap,      SYS_mremap,    SYS_mprotect,
                              SYS_madvise, SYS_brk,          SYS_futex,       SYS_getrandom, SYS_clock_gettime,
@@ -48,7 +48,7 @@ bool limitResources() {
     };
     if (limitsMemory && !limit(RLIMIT_AS, memoryBytesMax))
         return false;
-    // What is open stays so; nothing can be opened any more, not even in the place of what is closed.
+    // Open descriptors stay open; nothing more can be opened, not even in the place of one that is closed.
     return limit(RLIMIT_NOFILE, 0) && limit(RLIMIT_FSIZE, 0) && limit(RLIMIT_NPROC, 0) && limit(RLIMIT_CORE, 0);
 }
 

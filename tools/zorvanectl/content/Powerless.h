@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What a process gives up before it looks at hostile bytes: all but computing, and what it has open.
+// The powers that a process gives up before it looks at hostile bytes: all but computing, and what it has open.
 //
 // As root it becomes nobody. Its terminal is no longer its own, and it ends with its parent. Limits keep it from
 // opening anything, and the kernel refuses (EPERM) every call but the few that memory, time and open descriptors need:

@@ -61,7 +61,7 @@ Outcome<void> SealedDirectory::raise() {
         if (entries.error() != 0)
             return failed("the new content cannot be listed", entries.error());
     }
-    // Where its owner moved it meanwhile, an empty directory stays there.
+    // An empty directory stays where its owner moved it meanwhile.
     if (const int removed = disk_->removeDirectory(container_, name_.c_str()); removed < 0 && removed != -ENOENT)
         return failed("the new content's directory cannot be removed", -removed);
     return {};

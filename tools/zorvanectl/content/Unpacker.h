@@ -61,7 +61,7 @@ private:
     [[nodiscard]] Outcome<void> makeFile(const Place& place);
     [[nodiscard]] Outcome<void> makeSymbolicLink(const Place& place);
     [[nodiscard]] Outcome<void> makeHardLink(const Place& place);
-    /// What an errno means for the entry that is being made.
+    /// The meaning of an errno for the entry that is being made.
     [[nodiscard]] std::unexpected<Failure> cannotMake(int number) const;
 
     zor::platform::Disk& disk_;
@@ -72,7 +72,7 @@ private:
     std::size_t begin_ = 0;
     std::size_t end_ = 0;
     Entry entry_;
-    /// Of a regular file, while its data comes.
+    /// The descriptor of a regular file, while its data comes.
     zor::platform::FileDescriptor file_;
     std::int64_t fileEnd_ = 0;
     std::string parentPath_;
