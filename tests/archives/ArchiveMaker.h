@@ -14,7 +14,7 @@ struct Made {
     std::string name;
     mode_t mode = S_IFREG | 0644;
     std::string data{};
-    /// Of a symbolic link, or of a hard link when that is said.
+    /// The target of a symbolic link, or of a hard link when that is said.
     std::string target{};
     bool hardLink = false;
     /// So many bytes of hole come before the data; for Form::tar.

@@ -86,7 +86,7 @@ TEST_F(Locks, WhoWaitsForWhom) {
         }
 }
 
-// Who waits for an identifier's own lock counts already, so a writer of all comes after it.
+// A thread that waits for an identifier's own lock counts already, so a writer of all comes after it.
 TEST_F(Locks, AnAdmittedIdentifierComesBeforeAWriterOfAll) {
     locks._lock_identifier("A", LockMode::reading);
     std::vector<std::string> order;

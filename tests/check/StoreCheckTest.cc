@@ -230,7 +230,7 @@ std::vector<Damage> damages() {
     return rows;
 }
 
-// What is locked is no damage: one finding says so of what hides it, and nothing of what is in it is mended or missed.
+// Locked content is no damage: one finding says so of what hides it, and nothing of the content is mended or missed.
 TEST(StoreCheckTest, WhatIsLockedIsNotDamaged) {
     Store store;
     support::EncryptedDisk disk(store.world.path("private/var/encrypted"));

@@ -69,7 +69,7 @@ public:
         EXPECT_EQ(content(), empty_);
     }
 
-    /// Of an item in the container.
+    /// The status of an item in the container.
     [[nodiscard]] struct stat statusOf(const std::string& name) const {
         struct stat status{};
         EXPECT_EQ(::lstat(path("/container/" + name).c_str(), &status), 0) << name;
@@ -93,7 +93,7 @@ private:
     [[nodiscard]] std::string outside() const {
         return readTree(directory_.path(), {"container", "source", "archive"}).describe();
     }
-    /// What shows in the container: ".install-" is closed to its owner.
+    /// The content that shows in the container: ".install-" is closed to its owner.
     [[nodiscard]] std::string content() const {
         std::string shown;
         std::istringstream lines(readTree(path("/container"), {metadata}).describe());

@@ -65,8 +65,8 @@ std::uint64_t changesOf(StoreDaemon& daemon) {
     return changes;
 }
 
-/// What the old device must have become. A bundle whose owner could not be changed for once stays as it is, in place
-/// and whole: the migration is not made again for its sake.
+/// Judges what the old device must have become. A bundle whose owner could not be changed for once stays as it is, in
+/// place and whole: the migration is not made again for its sake.
 enum class Bundle { known, inPlace };
 std::string judgeMigrated(const std::string& root, StoreDaemon& daemon, Bundle expected) {
     const TestRoot at("", root);
@@ -103,7 +103,7 @@ Bundle expectationAfter(const OldDevice& old, const FaultOutcome& outcome) {
     return done && asItWas && oneError ? Bundle::inPlace : Bundle::known;
 }
 
-/// Of a boot that finishes the migration, and one that finds nothing to do.
+/// Judges a boot that finishes the migration, and one that finds nothing to do.
 std::string judgeNextBoots(const std::string& root, Bundle expected) {
     platform::LinuxDisk disk{platform::Syncs::off};
     test::FlagBootMarker marker;

@@ -11,7 +11,7 @@ namespace {
 
 using test::nameOf;
 
-// What changes a container that is there. Its identifier, and the file that tells its content from another's.
+// The container that the scenarios change: its identifier, and the file that tells its content from another's.
 const Request changed{"com.example.changed", ContainerClass::dataApplication, mobileUser};
 constexpr const char* contentName = "content";
 

@@ -21,13 +21,13 @@ plist::Dictionary groupsAndSystemContainer() {
 
 using Victims = std::vector<Acknowledged>;
 
-/// An error may leave a container where it is, which is logged and no failure. What counts is what the daemon says.
+/// An error may leave a container where it is, which is logged and no failure. The daemon's word is what counts.
 bool saysTheyAreGone(Device& device, const std::vector<Request>& requests) {
     return std::ranges::all_of(
         requests, [&](const Request& request) { return device.daemon->lookUp(request).code == ErrorCode::notFound; });
 }
 
-/// What was acknowledged as gone is gone; anything else is whole or gone, and can be had again.
+/// A container that was acknowledged as gone is gone; any other is whole or gone, and can be had again.
 std::string judgeGone(const std::string& root, bool acted, const std::vector<Request>& requests) {
     LaterDaemon later(root);
     StoreDaemon& daemon = later.daemon;

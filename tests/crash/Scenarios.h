@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the daemon does to the disk, one scenario each, for the loops over faults and power cuts.
+// The daemon's changes of the disk, one scenario each, for the loops over faults and power cuts.
 #pragma once
 
 #include "crash/StoreWorld.h"
@@ -12,7 +12,7 @@ inline constexpr std::uint32_t mobileUser = 501;
 inline constexpr std::uint32_t bundleUser = 33;
 inline constexpr std::uint32_t systemUser = 499;
 
-/// Of an application.
+/// The entitlements of an application.
 plist::Dictionary entitlements(plist::Array appGroups, plist::Array systemGroups = {}, bool systemContainer = false);
 
 /// Ends a test whose start could not be made.
@@ -23,11 +23,11 @@ struct Scenario {
     bool worksAtHome = false;
     /// Whether the device's file systems exchange names.
     bool exchanges = true;
-    /// Runs before the first fault or cut, on a launched daemon. What it puts into `promised` stays promised.
+    /// Runs before the first fault or cut, on a launched daemon. Containers that it puts into `promised` stay promised.
     std::function<void(Device&)> prepare;
     /// Puts what was acknowledged into `promised`.
     std::function<void(Device&)> act;
-    /// What a client may ask for afterwards.
+    /// The containers that a client may ask for afterwards.
     std::vector<Request> requests;
     /// Whether the daemon that met an error must serve the requests at once. A daemon cannot be asked for what a test
     /// took from under it.
@@ -51,7 +51,7 @@ struct Scenario {
 
 /// Creation in each group of classes, transient creation again, death row, the entitlement file, the launch.
 std::vector<Scenario> storeScenarios();
-/// What changes a container that is there.
+/// Changes of a container that is there.
 std::vector<Scenario> changeScenarios();
 /// Deletion, the loss of last references, and the first use of groups.
 std::vector<Scenario> deletionScenarios();

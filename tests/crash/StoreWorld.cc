@@ -8,7 +8,7 @@ namespace zor::support {
 
 namespace {
 
-/// What must hold of a store at rest.
+/// Judges what must hold of a store at rest.
 std::string judgeAtRest(const std::string& root, const std::vector<Acknowledged>& promised, Leftovers leftovers) {
     const FileTree tree = readTree(root, {"run"});
     const StoreFindings findings = judgeStore(tree, Transients::judged);
@@ -60,8 +60,8 @@ std::string judgeRequests(StoreDaemon& daemon, const std::string& root, std::vec
     return judgeAtRest(root, promised, leftovers);
 }
 
-/// What a user would be told of a store that was launched: nothing, but what the next boot or write clears, and empty
-/// directories that never got their names.
+/// Judges what a user would be told of a store that was launched: nothing, but what the next boot or write clears, and
+/// empty directories that never got their names.
 std::string judgeByCheck(const std::string& root, const platform::BootMarker& marker) {
     const auto system = check::CheckedSystem::open(root);
     if (!system)

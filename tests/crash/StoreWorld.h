@@ -21,7 +21,7 @@ inline fs::Ordering noOrderAnywhere(int) {
     return fs::Ordering::none;
 }
 
-/// What asks for a container, and what it got.
+/// A request for a container, and what the request got.
 struct Request {
     std::string identifier;
     ContainerClass containerClass;
@@ -92,7 +92,7 @@ struct LaterDaemon {
     StoreDaemon daemon;
 };
 
-/// Where private/var/mobile lies: on the root's file system, or on one mounted there.
+/// The file system on which private/var/mobile lies: the root's, or one mounted there.
 enum class Home { onRoot, mounted };
 
 /// A disk on whose file systems no two names can be exchanged.
@@ -142,7 +142,7 @@ struct Device {
             throw std::runtime_error("cannot create " + request.identifier + daemon->log());
         return *answer.acknowledged;
     }
-    /// Promises a path that was answered. What the daemon does not find there is promised too, and missed.
+    /// Promises a path that was answered. A container that the daemon does not find there is promised too, and missed.
     void promise(const Request& request, const std::string& path) {
         const auto found = daemon->lookUp(request);
         add(promised, {request, path, found.acknowledged ? found.acknowledged->uuid : ""});
@@ -159,7 +159,7 @@ struct Device {
     /// Before it starts: whether its file systems exchange names.
     bool exchanges = true;
     std::optional<WithoutExchange> withoutExchange;
-    /// What the daemon runs on.
+    /// The disk that the daemon runs on.
     platform::Disk* disk = nullptr;
     fs::Durability::Probe probe = journalEverywhere;
     std::unique_ptr<StoreDaemon> daemon;

@@ -80,7 +80,7 @@ TEST(BootMarker, BelievesOnlyItsOwn) {
             EXPECT_EQ(marker.look().foreign, mark == semaphore);
             ::unlink((mark + ".link").c_str());
         }
-    // Who keeps the semaphore's name taken makes no launch a boot.
+    // Nobody makes a launch a boot by keeping the semaphore's name taken.
     marker.forget();
     ASSERT_EQ(::mkdir(semaphore.c_str(), 0755) | ::mkdir((semaphore + "/kept").c_str(), 0755), 0);
     EXPECT_FALSE(marker.make());
@@ -175,7 +175,7 @@ TEST(SandboxUserState, MapsReplacesAndRemoves) {
     EXPECT_FALSE(sandbox.setMapping(501, data, "a/b", std::nullopt));
     EXPECT_NE(::access(test.path("run/zorvane/sandbox").c_str(), F_OK), 0) << "a removal makes nothing";
     EXPECT_FALSE(sandbox.setMapping(501, data, "a/b", "/first"));
-    // What a kill between the two steps leaves under a name that is used again.
+    // A kill between the two steps leaves this link under a name that is used again.
     ASSERT_EQ(::symlink("x", test.path("run/zorvane/sandbox/501/1/.new-1").c_str()), 0);
     EXPECT_FALSE(sandbox.setMapping(501, data, "a/b", "/second"));
     EXPECT_FALSE(sandbox.setMapping(501, SandboxItemType::groupContainer, "a/b", "/group"));
@@ -259,7 +259,7 @@ TEST(FileProtectionClass, RefusesWhatALockTakesAway) {
         EXPECT_EQ(protection.classOf(file.get()), 3) << text;
     }
     EXPECT_EQ(protection.setClass(-1, 1).number(), EBADF);
-    // What an encryption keeps from being read can be opened for its path alone.
+    // A file that an encryption keeps from being read can be opened for its path alone.
     const FileDescriptor path(::open(test.path("file").c_str(), O_PATH | O_CLOEXEC));
     EXPECT_EQ(protection.setClass(path.get(), 4).number(), 0);
     EXPECT_EQ(protection.classOf(path.get()), 4);

@@ -209,13 +209,13 @@ TEST_P(CopyFidelity, KeepsWhatIsMeantToBeKept) {
         }
         if (row.check)
             row.check(original, copy);
-        // What exists is never replaced or added to.
+        // An item that exists is never replaced or added to.
         EXPECT_EQ(copyTree(disk, from.get(), row.name, to.get(), name.c_str()), -EEXIST);
     }
     EXPECT_EQ(before.leakedSince(), "");
 }
 
-// What cannot be copied faithfully fails the copy, in a tree as on its own.
+// An item that cannot be copied faithfully fails the copy, in a tree as on its own.
 TEST(CopyTree, RefusesWhatItCannotCopy) {
     World world;
     makeDirectory(world.fd(), "tree");

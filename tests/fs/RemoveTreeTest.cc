@@ -75,7 +75,7 @@ TEST(RemoveTree, ClearsFlagsOfDirectoriesInsideTheTree) {
             EXPECT_EQ(said.text, withCallbacks ? row.said : "") << row.path;
             EXPECT_EQ(exists(top.get(), "tree"), row.result != 0) << row.path;
             EXPECT_FALSE(exists(top.get(), "tree/a/empty")) << row.path;
-            // What was not to be touched still has its flag; then the test may clean up.
+            // An item that was not to be touched still has its flag; then the test may clean up.
             if (row.result != 0) {
                 EXPECT_EQ(flagsOf(root.get(), row.path), row.flags) << row.path;
                 setFlags(root.get(), row.path, 0);

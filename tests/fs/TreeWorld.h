@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the tests of the tree operations stand on: a world with a tree to work on and one beside it that must not
+// The ground of the tests of the tree operations: a world with a tree to work on and one beside it that must not
 // change, and an owner of the tree who moves it about meanwhile.
 #pragma once
 
@@ -52,7 +52,7 @@ inline std::uint64_t allocated(int parent, const std::string& path) {
     return static_cast<std::uint64_t>(statusOf(parent, path).st_blocks) * 512;
 }
 
-/// Runs `body` in a child with mounts of its own. False: not permitted here. What `body` expects in vain is a failure.
+/// Runs `body` in a child with mounts of its own. False: not permitted here. A vain expectation of `body` is a failure.
 bool inMountNamespace(const std::function<void()>& body);
 
 /// "a0", "a0/a1" and so on.
@@ -76,7 +76,7 @@ public:
     World();
 
     void makeTree();
-    /// What changed outside the tree since the world was made; empty when nothing did.
+    /// The changes outside the tree since the world was made; empty when there are none.
     [[nodiscard]] std::string damage() const {
         const std::string now = outside();
         return now == before_ ? "" : "outside was\n" + before_ + "and is\n" + now;

@@ -123,7 +123,7 @@ TEST(IdentityRegistry, UnitesTheEntriesOfAnIdentifier) {
     EXPECT_EQ(together(), std::nullopt);
 }
 
-// What could have been put there by others, or could hold up the reader, is ignored and said once.
+// A file that others could have put there, or that could hold up the reader, is ignored and said once.
 TEST(IdentityRegistry, IgnoresWhatMayBeForged) {
     PeerWorld world;
     const auto placeFor = [&](const std::string& file) { return world.test.path(PeerWorld::pathOf(file)); };

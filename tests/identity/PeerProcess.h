@@ -147,7 +147,7 @@ struct PeerWorld {
                     const std::string& more = "") const {
         test.replace(pathOf(file), named(name, identifier, more));
     }
-    /// Of a registry file, from the root.
+    /// The path of a registry file, from the root.
     [[nodiscard]] static std::string pathOf(const std::string& file) {
         return std::string(names::identityDirectory) + "/" + file;
     }
@@ -162,7 +162,7 @@ struct PeerWorld {
     PeerServer server;
 };
 
-/// What the peer is now: its identifier, "" for a grant without one, "-" for no grant.
+/// The identity of the peer: its identifier, "" for a grant without one, "-" for no grant.
 inline std::string who(Peer& peer) {
     const Identity identity = peer.identify(Peer::Explain::no);
     return !identity.grant ? "-" : identity.grant->identifier.value_or("");

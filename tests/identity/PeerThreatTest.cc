@@ -41,8 +41,8 @@ TEST(PeerThreat, NamesInAnotherMountNamespace) {
     EXPECT_EQ(judged(world.program("other"), world.program("agent")), "agent");
 }
 
-// Who gets the number of a process that has ended gets nothing else of it, whether that one was accepted before or
-// never.
+// A process that gets the number of one that has ended gets nothing else of it, whether that one was accepted before
+// or never.
 TEST(PeerThreat, ANumberThatIsUsedAgain) {
     using Connects = PeerStart::Connects;
     PeerWorld world;

@@ -35,7 +35,7 @@ struct FileLog {
         log.enableDiskLogging(root.path("log"), fileCount, bytesMax);
     }
     void write(const std::string& message, int level = 3) { log.write(level, "f", message); }
-    /// Of one of the files.
+    /// The text of one of the files.
     [[nodiscard]] std::string text(unsigned index = 0) const {
         return root.read(index == 0 ? "log" : "log." + std::to_string(index));
     }

@@ -58,7 +58,7 @@ private:
     const Syncs syncs_;
     UnitFences fences_;
     std::optional<Program> daemon_;
-    /// What earlier ones said.
+    /// The output of earlier daemons.
     std::string said_;
 };
 

@@ -41,9 +41,9 @@ struct Outcome {
 };
 /// Runs a program to its end.
 Outcome runProgram(const std::vector<std::string>& words);
-/// Where the built programs lie.
+/// The path of a built program.
 std::string programPath(const std::string& name);
-/// Where the sources of what is installed beside them lie.
+/// The path of a source of what is installed beside the programs.
 std::string packagingPath(const std::string& name);
 /// The program that asks.
 std::string ownProgram();

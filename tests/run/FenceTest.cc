@@ -16,7 +16,7 @@
 namespace zorvanerun {
 namespace {
 
-/// What a process says that does this in the place of the test.
+/// The words of a process that does this in the place of the test.
 std::string saidBy(const std::function<std::string()>& act) {
     int ends[2] = {};
     EXPECT_EQ(::pipe(ends), 0);

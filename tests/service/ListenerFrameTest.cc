@@ -34,7 +34,7 @@ TEST(ListenerFrame, BrokenFramesEndTheirConnectionOnly) {
             RawClient client = world.connect();
             plist::Data bytes = behindAGoodOne ? frameOf(numbered(1), 8) : plist::Data();
             append(bytes, broken);
-            // What comes after it is not served either.
+            // A frame after the broken one is not served either.
             append(bytes, frameOf(numbered(2), 10));
             ASSERT_TRUE(client.send(bytes));
             EXPECT_TRUE(!behindAGoodOne || client.receives(8, numbered(1)));

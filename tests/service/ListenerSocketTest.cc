@@ -108,7 +108,7 @@ private:
 };
 
 // Clients that are silent, send rubbish, vanish at once or leave a large reply unread: each gets one frame about itself
-// and the end, and nothing is left open. What does not fit into a socket's buffer costs the details, not the answer.
+// and the end, and nothing is left open. A reply that does not fit into a socket's buffer loses its details alone.
 TEST(ListenerStatus, EveryPeerGetsOneReplyAndTheEnd) {
     const support::ProcessResources before;
     {

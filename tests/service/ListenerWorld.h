@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the tests of sockets stand on: a listener over its own socket with a handler that the test gives, peers that are
+// The ground of the tests of sockets: a listener over its own socket with a handler that the test gives, peers that are
 // what the kernel says, and raw clients that may send any bytes.
 #pragma once
 
@@ -46,7 +46,7 @@ public:
     /// Everybody when there is none.
     std::optional<uid_t> owner;
     std::atomic<bool> knowsPeers{true};
-    /// What every peer is granted.
+    /// The grant that every peer gets.
     std::atomic<bool> kernelAgent{false};
     /// Peers that exist; each connection has one until it has ended.
     std::atomic<int> peers{0};
@@ -222,7 +222,7 @@ public:
         if (listener_)
             listener_->stop();
     }
-    /// Where everything was given back: no connection, no byte, no peer. Waits up to ten seconds for it.
+    /// Whether everything was given back: no connection, no byte, no peer. Waits up to ten seconds for that.
     bool isAtRest() {
         return eventually([this] {
             const ListenerCounters now = counters();

@@ -24,7 +24,7 @@ constexpr std::array<uid_t, 2> owners = {0, 501};
 /// So many of the victims, the first ones, lead to containers; the daemon moves the others about itself.
 constexpr std::size_t placesOnTheWay = 3;
 
-/// Where the second user's containers lie and what leads there, at every depth.
+/// The places where the second user's containers lie and those that lead there, at every depth.
 std::vector<std::string> victimsBelow(const std::string& home) {
     std::vector<std::string> victims = {home + "Containers", home + "Containers/Data",
                                         home + "Containers/Data/Application"};
@@ -150,7 +150,7 @@ void HostileOwner::swapOnce(const std::string& victim) {
     else if (trick == 1)
         ::mkfifo(victim.c_str(), 0666);
     std::this_thread::sleep_for(std::chrono::microseconds(swapping_.upTo(3000)));
-    // What the daemon has made there meanwhile goes, or stays under another name.
+    // An item that the daemon has made there meanwhile goes, or stays under another name.
     if (!files::is_directory(files::symlink_status(victim, error)))
         files::remove(victim, error);
     files::rename(aside, victim, error);

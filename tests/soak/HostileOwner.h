@@ -18,7 +18,7 @@ public:
     /// Two threads' work, until the session is stopped.
     void ask();
     void swap();
-    /// What changed outside; empty when nothing did.
+    /// The changes outside; empty when there are none.
     [[nodiscard]] std::string changedOutside() const;
 
 private:

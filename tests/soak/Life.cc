@@ -45,7 +45,7 @@ void becomeUser(std::uint32_t user) {
 struct Known {
     /// Absent: made by a request whose answer did not come.
     std::optional<std::array<std::uint8_t, 16>> uuid;
-    /// Of the file that the client keeps there, and of the value that it attached; empty without.
+    /// The content of the file that the client keeps there, and the value that it attached; empty without.
     std::string content;
     std::string value;
 
@@ -79,7 +79,7 @@ public:
     void doubtValue() { valueDoubted_ = true; }
     /// A request was not answered, or not carried out: what it was to make may be there or not, never half.
     void mayBe(State other) { states_.push_back(std::move(other)); }
-    /// What was seen has to be one of the possible states.
+    /// The state that was seen has to be one of the possible ones.
     [[nodiscard]] bool observe(const State& seen) {
         for (const State& possible : states_)
             if (possible.has_value() == seen.has_value() && (!seen || possible->fits(*seen, valueDoubted_))) {
@@ -154,7 +154,7 @@ private:
         Model model;
     };
 
-    /// What any call may be answered with: the daemon went away, or its surroundings are in trouble.
+    /// The errors that any call may be answered with: the daemon went away, or its surroundings are in trouble.
     template <typename T>
     [[nodiscard]] bool excused(const zorvane::Result<T>& answer) {
         const Error& error = answer.error();
@@ -404,7 +404,7 @@ private:
             return;
         }
         groups_.push_back(wanted);
-        // What could not be written is undone at the next start, or written with the next registration.
+        // Groups that could not be written are undone at the next start, or written with the next registration.
         groupsDoubted_ = groupsDoubted_ || done.error().kind == Error::Kind::daemon;
     }
 

@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// What all threads of a soak share: the daemon, whether its surroundings are as they should be, and what was found.
+// The state that all threads of a soak share: the daemon, whether its surroundings are as they should be, and what was
+// found.
 #pragma once
 
 #include "process/DaemonProcess.h"
@@ -20,8 +21,8 @@ inline void sleepMilliseconds(std::uint64_t milliseconds) {
     std::this_thread::sleep_for(std::chrono::milliseconds(milliseconds));
 }
 
-/// What is drawn by lot. The same seed makes the same choices, whatever the standard library: no distribution of its
-/// own is used.
+/// Choices by lot. The same seed makes the same choices, whatever the standard library: no distribution of its own is
+/// used.
 class Choices {
 public:
     Choices(std::uint64_t seed, std::uint64_t stream) : random_(seed * 1'000'003 + stream) {}
@@ -33,8 +34,8 @@ private:
     std::mt19937_64 random_;
 };
 
-/// For std::shared_lock and std::unique_lock. Who wants it alone gets it next: a lock that prefers sharers would never
-/// be free of clients that ask without pause.
+/// For std::shared_lock and std::unique_lock. A thread that wants the gate alone gets it next: a lock that prefers
+/// sharers would never be free of clients that ask without pause.
 class Gate {
 public:
     void lock_shared() {
@@ -56,7 +57,7 @@ private:
     std::shared_mutex inside_;
 };
 
-/// What is wrong with the surroundings on purpose. It changes only while no client is inside a request.
+/// A fault of the surroundings that is made on purpose. It changes only while no client is inside a request.
 enum class Trouble : std::uint8_t { none, diskFull, fewDescriptors };
 
 class Session {
@@ -83,7 +84,7 @@ public:
     /// Clients end at their next request.
     std::atomic<bool> stopped{false};
 
-    /// What is told at the end, or meanwhile.
+    /// The facts that are told at the end, or meanwhile.
     struct Record {
         std::vector<std::string> findings;
         std::map<std::string, Count> counts;

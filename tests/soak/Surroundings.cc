@@ -25,8 +25,8 @@ zorvane::Client::Lookup lateLookup() {
     return {.containerClass = whole::dataApplication, .user = lateUser, .identifier = lateIdentifier, .create = true};
 }
 
-/// What may be found of a store in use: clients take directories away, a kill comes amid a change of the protection
-/// class, errors leave what the next start clears.
+/// Whether a store in use may have the finding: clients take directories away, a kill comes amid a change of the
+/// protection class, errors leave what the next start clears.
 bool isAllowed(const nlohmann::json& finding) {
     static const std::set<std::string> clearedByItself = {"launch", "boot", "next-write", "none"};
     static const std::set<std::string> codes = {"subdirectory-missing", "subdirectory-attributes", "protection-differs",

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// What happens to the daemon: kills, orderly ends, boots, locks of the device, a full disk, too few descriptors,
-// homes that are missing, mounts that hang. And what must hold whenever it starts again.
+// The events that the daemon meets: kills, orderly ends, boots, locks of the device, a full disk, too few descriptors,
+// homes that are missing, mounts that hang. And what must hold whenever the daemon starts again.
 #pragma once
 
 #include "soak/Session.h"

@@ -36,7 +36,7 @@ public:
         : directory_("/dev/shm"), mounted_(::mount("soak", directory_.path().c_str(), "tmpfs", 0,
                                                    ("mode=0755,size=" + std::to_string(diskBytes)).c_str()) == 0) {}
     ~SmallDisk() {
-        // What is mounted below it goes with it.
+        // Mounts below the disk go with it.
         if (mounted_)
             ::umount2(directory_.path().c_str(), MNT_DETACH);
     }

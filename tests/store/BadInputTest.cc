@@ -202,7 +202,7 @@ TEST_P(BadRequest, IsRefusedAndChangesNothing) {
             message.set(key.name, filled(key.good));
         return message;
     };
-    // What the requests find, and the directories that any of them may make.
+    // The containers that the requests find, and the directories that any of them may make.
     for (const char* identifier : {"installer", "gone"})
         (void)makeContainer(identifier);
     (void)makeContainer("plug-in", 4);
@@ -225,7 +225,7 @@ TEST_P(BadRequest, IsRefusedAndChangesNothing) {
         return false;
     }});
     const auto attempt = [&](const char* key, const std::optional<Value>& value, std::uint64_t code) {
-        // What can be no identifier is told before anything is looked up.
+        // A text that can be no identifier is told before anything is looked up.
         const std::string* text = value ? value->asString() : nullptr;
         if (text && std::string_view(key).ends_with("Identifier") && !ipc::isIdentifier(*text))
             code = 11;

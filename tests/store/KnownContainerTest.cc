@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What is asked of one container by its UUID: info values, its record, its structure, its directory's name, its size.
+// Requests about one container by its UUID: info values, its record, its structure, its directory's name, its size.
 #include "operations/ZORGroupManager.h"
 #include "support/OpenWatch.h"
 #include "world/World.h"

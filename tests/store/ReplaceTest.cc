@@ -20,7 +20,7 @@ using support::FaultSpan;
 using Preserve = ZORClientConnection::PreserveOldUUID;
 
 constexpr ContainerClass bundle = ContainerClass::bundleApplication;
-// What the journals that a test puts speak of.
+// The names and places in the journals that a test puts.
 const std::string journal = "11111111-1111-4111-8111-111111111111";
 const std::string waiting = staging + "/" + journal;
 const std::string oldPlace = applications + "/22222222-2222-4222-8222-222222222222";

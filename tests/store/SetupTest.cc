@@ -61,7 +61,7 @@ TEST(Setup, Orphans) {
     }
     const std::string fileNamed = applications + "/44444444-0000-4000-8000-000000000000";
     world.write(fileNamed, "a file with a good name");
-    // What moves across file systems hide lies beside what is moved, and beside where it goes.
+    // Hidden items of moves across file systems lie beside what is moved, and beside where that goes.
     const std::string parents[] = {applications,
                                    shared,
                                    shared + "/Bundle",

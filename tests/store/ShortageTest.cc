@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the daemon could not look at, for want of descriptors or because the disk refused: it deletes nothing for that,
-// and keeps no answer that came of it.
+// Items that the daemon could not look at, for want of descriptors or because the disk refused: it deletes nothing for
+// that, and keeps no answer that came of it.
 #include "support/FewDescriptors.h"
 #include "world/World.h"
 

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What becomes of another's directory that is renamed to a name which the daemon wants: whoever may write the directory
+// The fate of another's directory that is renamed to a name which the daemon wants: whoever may write the directory
 // above can do that, also where he may not look inside.
 #include "world/World.h"
 

@@ -16,7 +16,7 @@ namespace zor::support {
 
 class EncryptedDisk {
 public:
-    /// Mounts it at `mountPoint`, a directory that is made if missing. Where that cannot be (not root, no loop device,
+    /// Mounts it at `mountPoint`, a directory that is made if missing. If that cannot be (not root, no loop device,
     /// a kernel without this encryption) the disk is not there, and `missing()` says why.
     explicit EncryptedDisk(const std::string& mountPoint) : mountPoint_(mountPoint), missing_(make()) {}
     ~EncryptedDisk() {

@@ -32,7 +32,7 @@ struct Inode {
     gid_t gid = 0;
     /// The file system that it was made on; not part of what the tree is.
     dev_t device = 0;
-    /// Of a regular file its bytes, of a symbolic link its target.
+    /// The bytes of a regular file, the target of a symbolic link.
     Bytes content;
     std::map<std::string, Bytes> attributes;
     std::map<std::string, InodeId> entries;
@@ -54,7 +54,7 @@ struct FileTree {
     [[nodiscard]] bool isTree() const;
 };
 
-/// What a whole tree looks like on disk now. `excluded` are paths relative to it, left out with all below them.
+/// A whole tree as it is on disk. `excluded` are paths relative to the tree, left out with all below them.
 /// `known`, when given, learns which inode is which. Throws std::system_error where it cannot be read.
 FileTree readTree(const std::string& directory, const std::set<std::string>& excluded = {},
                   std::map<DeviceInode, InodeId>* known = nullptr);

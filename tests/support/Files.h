@@ -16,7 +16,7 @@
 
 namespace zor::support {
 
-/// What a system call returned, unless it failed.
+/// The result of a system call, unless the call failed.
 template <typename Result>
 Result checked(Result result, const std::string& what) {
     if (result < 0)

@@ -34,7 +34,7 @@ public:
                       S_ISDIR(status.st_mode) ? 040755U : 0100644U, server, server);
         mounted_ = ::mount(at_.c_str(), at_.c_str(), "fuse", MS_NOSUID | MS_NODEV, options) == 0;
     }
-    /// Who waits for it then gets an error.
+    /// A call that waits for the file system then gets an error.
     ~HangingFileSystem() {
         fallSilent();
         device_.reset();

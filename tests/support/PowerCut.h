@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What a disk may hold after a power cut, built from a log of disk operations. Each file system of the tree keeps its
+// Disks as a power cut may leave them, built from a log of disk operations. Each file system of the tree keeps its
 // own order and knows nothing of the others'.
 //
 // orderedJournal (ext4 with data=ordered, XFS): changes of names, modes, owners and attributes become durable in their

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What a process holds that an operation could leak: descriptors and threads.
+// The resources of a process that an operation could leak: descriptors and threads.
 #pragma once
 
 #include <filesystem>
@@ -22,7 +22,7 @@ public:
         }();
         threads_ = runtimeStarted ? countThreads() : 0;
     }
-    /// What is there now and was not then, in words; empty when nothing is. Threads get a second to end.
+    /// The resources that have come since, in words; empty when there are none. Threads get a second to end.
     [[nodiscard]] std::string leakedSince() const {
         std::string leaked;
         for (const auto& [fd, target] : openDescriptors())

@@ -2,8 +2,8 @@
 // A Disk over a real directory tree that keeps a log of what each successful call did, in terms of inodes.
 //
 // The log and the tree at its start are all that PowerCut needs. The recorder keeps the tree in memory too: at the end
-// it must equal the one on disk, so a call that changes the disk without going through Disk is found as well. What lies
-// outside the tree or below an excluded path (sockets, logs, the run directory) passes through unrecorded. Calls are
+// it must equal the one on disk, so a call that changes the disk without going through Disk is found as well. Items
+// outside the tree or below an excluded path (sockets, logs, the run directory) pass through unrecorded. Calls are
 // made one at a time, so that the log's order is the disk's. Any thread.
 #pragma once
 
@@ -22,7 +22,7 @@ struct LoggedOperation {
     InodeId inode = 0;
     /// The file system that it happens on.
     dev_t device = 0;
-    /// Where its name is, or was before a rename.
+    /// The directory that holds the inode's name, or held it before a rename.
     InodeId directory = 0;
     std::string name;
     /// A rename's destination.
@@ -66,8 +66,8 @@ public:
     /// Notes that what was done so far is acknowledged.
     void mark();
     [[nodiscard]] DiskLog log() const;
-    /// What speaks against the log: calls that could not be followed, and where the recorded tree and the one on disk
-    /// differ now. Empty when nothing does.
+    /// The complaints about the log: calls that could not be followed, and differences between the recorded tree and
+    /// the one on disk. Empty when there are none.
     [[nodiscard]] std::string complaint() const;
 
     int makeHardLink(int fromDirectory, const char* from, int toDirectory, const char* to) override;
@@ -83,7 +83,7 @@ private:
     /// 0 when the inode is not recorded.
     InodeId find(int fd) ZOR_REQUIRES(mutex_);
     [[nodiscard]] InodeId findEntry(InodeId directory, const std::string& name) const ZOR_REQUIRES(mutex_);
-    /// Where a name is that was given as a path below an open directory.
+    /// The place of a name that was given as a path below an open directory.
     struct Place {
         InodeId directory = 0;
         std::string name;

@@ -66,7 +66,7 @@ public:
         return messages;
     }
 
-    /// What a line told last of the request that it belongs to: "NAME=VALUE " for each field.
+    /// The fields that a line told last of the request that it belongs to: "NAME=VALUE " for each.
     std::string request() {
         const platform::MutexLock held(mutex_);
         return request_;

@@ -21,9 +21,9 @@ struct StoredContainer {
 struct StoreFindings {
     /// Those that are whole.
     std::vector<StoredContainer> containers;
-    /// What is half made, or lies where nothing of its kind may.
+    /// The item that is half made, or lies where nothing of its kind may.
     std::string complaint;
-    /// What is there a second time.
+    /// The container that is there a second time.
     std::string doubled;
     /// Names, hidden ones too.
     std::vector<std::string> staging;

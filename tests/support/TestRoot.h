@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // A directory that stands for a device's root, and short ways to make and see what lies in it. Paths are relative to
-// it; "" is the root itself. What cannot be made throws std::system_error. One thread.
+// it; "" is the root itself. An item that cannot be made throws std::system_error. One thread.
 #pragma once
 
 #include "os/LinuxDisk.h"

@@ -118,7 +118,7 @@ TEST(Life, FilesThatMayNotGrow) {
 using nlohmann::json;
 
 /// Judges a document by one of the schemas that are installed, as far as they use the language: a word of a schema that
-/// is not known here is a fault. Where and how the document differs; empty when it does not.
+/// is not known here is a fault. Returns where and how the document differs; empty when it does not.
 std::string differenceFromSchema(const json& schema, const json& document);
 
 bool hasType(const std::string& type, const json& document) {
@@ -359,7 +359,7 @@ TEST(Tool, FitsTheTerminal) {
     EXPECT_NE(daemon.tool({"list", "--class", "2"}).output.find("  org.example.short\n"), std::string::npos);
 }
 
-/// What a shell may put after these words.
+/// The words that a shell may put after these.
 std::vector<std::string> completed(const DaemonProcess& daemon, std::vector<std::string> words, const char* typed) {
     words.insert(words.begin(), {programPath("zorvanectl"), "__complete", "--root", daemon.root()});
     words.emplace_back(typed);

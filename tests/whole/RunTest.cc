@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// zorvane-run as a service manager uses it: a real daemon, real containers, real sandboxes. What makes sandboxes needs
-// root, and a kernel that allows namespaces here.
+// zorvane-run as a service manager uses it: a real daemon, real containers, real sandboxes. A test that makes sandboxes
+// needs root, and a kernel that allows namespaces here.
 #include "process/DaemonProcess.h"
 #include "support/Frames.h"
 #include "support/Waiting.h"
@@ -218,7 +218,7 @@ TEST(Run, ItsOwnContainersAndNothingElse) {
         "! ls " + root + "/private/var/second && ! ls " + root + "/etc && ! ls " + root + "/run",
         "! ls /home && ! ls /root && ! ls /var && ! ls /run && ! ls /sys",
         "! ls /proc/1/root/ && ! ls /proc/1/cwd/",
-        // What it is.
+        // The program's own state.
         "grep -qx 'Uid:\t501\t501\t501\t501' /proc/self/status",
         "grep -qx 'Gid:\t501\t501\t501\t501' /proc/self/status",
         "grep -qx 'Groups:\t *' /proc/self/status",
@@ -231,7 +231,7 @@ TEST(Run, ItsOwnContainersAndNothingElse) {
         "test \"$(grep -c : /proc/net/dev)\" = 1 && test $(wc -l < /proc/net/unix) = 1",
         "test $(stat -f -c %c /tmp) -le 16384 && test $(stat -f -c %c /dev/shm) -le 16384",
         "test -z \"$ZORVANE_TEST_SECRET\" && test \"$LC_ALL\" = C.UTF-8",
-        // Of descriptors, the shell has the three; the fourth is what ls reads with.
+        // The shell has the three descriptors; the fourth is what ls reads with.
         "test \"$(ls /proc/self/fd | tr '\\n' ' ')\" = '0 1 2 3 '",
         "test $(ls -d /proc/[0-9]* | wc -l) -le 6",
     };

@@ -99,7 +99,8 @@ std::string directoryOf(std::uint32_t owner, mode_t mode = 0755);
 /// private/var/mobile as a file system of its own, in a mount namespace of this process.
 class MountedHome {
 public:
-    /// Of a furnished root. Asked for a namespace before a daemon opens the root, it can be mounted below that later.
+    /// Mounts the home of a furnished root. If a namespace is asked for before a daemon opens the root, the home can be
+    /// mounted below that later.
     explicit MountedHome(const std::string& root);
     ~MountedHome();
     MountedHome(const MountedHome&) = delete;
@@ -154,7 +155,7 @@ public:
         return std::make_shared<ZORClientConnection>(composition_->store(), std::move(client));
     }
     [[nodiscard]] platform::LinuxPlatform& linux() { return *platform_; }
-    /// What a boot does before it serves; a launch without one does the second half.
+    /// The work of a boot before the daemon serves; a launch without a boot does the second half.
     void boot() {
         daemonsClient().rebootContainerManagerSetup();
         launch();
@@ -225,7 +226,7 @@ public:
     }
     [[nodiscard]] FileURL url(std::string_view relative) const { return FileURL::directory(path(relative)); }
     [[nodiscard]] std::string relative(const std::string& absolute) const { return absolute.substr(path().size() + 1); }
-    /// What is under death row's unique directories, sorted.
+    /// The names under death row's unique directories, sorted.
     [[nodiscard]] std::vector<std::string> deathRow() const {
         std::vector<std::string> found;
         for (const std::string& unique : names(dead))
