@@ -57,8 +57,8 @@ public:
 
     void put(Composition& composition, std::span<const std::uint8_t> bytes) {
         const auto parent = composition.defaultManager().resolver().openParent(file_);
-        require(parent && fs::replaceFileDurably(platform_->roles().disk, parent->directory.get(), parent->name, 0644,
-                                                 bytes) == 0);
+        require(parent &&
+                !fs::replaceFileDurably(platform_->roles().disk, parent->directory.get(), parent->name, 0644, bytes));
         ::unlink((library_ + "/" + names::unreadableEntitlementFile).c_str());
     }
     [[nodiscard]] std::optional<plist::Dictionary> read(Composition& composition) {

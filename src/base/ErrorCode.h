@@ -1,18 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
-// Numbers of errors: the kernel's that say nothing of what was looked at, and the codes of ZORErrorDomain, as
-// "ReplyError" carries them to clients. A code, once given out, keeps its meaning.
+// The codes of ZORErrorDomain, as "ReplyError" carries them to clients. A code, once given out, keeps its meaning.
 #pragma once
 
-#include <cerrno>
 #include <cstdint>
-
-namespace zor::platform {
-
-[[nodiscard]] inline bool isOwnShortage(int errorNumber) {
-    return errorNumber == EMFILE || errorNumber == ENFILE || errorNumber == ENOMEM;
-}
-
-} // namespace zor::platform
 
 namespace zor {
 

@@ -111,12 +111,4 @@ ZORError posixError(Here here, Errno error, const char* format, ...) {
     return made;
 }
 
-ZORError posixError(Here here, int number, const char* format, ...) {
-    std::va_list arguments;
-    va_start(arguments, format);
-    ZORError error(here, ErrorDomain::posix, number, formattedList(format, arguments));
-    va_end(arguments);
-    return error;
-}
-
 } // namespace zor

@@ -27,8 +27,6 @@ struct Here {
 };
 #define ZOR_HERE (::zor::Here{__func__, __LINE__})
 
-using platform::isOwnShortage;
-
 class ZORError {
 public:
     ZORError(Here here, ErrorDomain domain, int code, std::optional<std::string> description,
@@ -75,18 +73,8 @@ ZORError makeError(const Log& log, Here here, ErrorCode code, const ZORError* un
 /// An error of the POSIX domain; never logs.
 ZORError posixError(Here here, Errno error, const char* format, ...) __attribute__((format(printf, 3, 4)));
 
-ZORError posixError(Here here, int number, const char* format, ...) __attribute__((format(printf, 3, 4)));
-
 /// The level-3 line of an error that was made without one.
 void logError(const Log& log, const ZORError& error);
-
-/// The text of an errno value, safe in any thread.
-inline const char* errorText(int number) {
-    return Errno(number).text();
-}
-inline const char* errorText(Errno error) {
-    return error.text();
-}
 
 template <typename T>
 class [[nodiscard]] Result : public std::expected<T, ZORError> {

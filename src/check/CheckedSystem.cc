@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "check/CheckedSystem.h"
 
+#include "base/Try.h"
 #include "identity/UserConfiguration.h"
 #include "os/SystemRoot.h"
 
@@ -24,10 +25,8 @@ std::expected<std::unique_ptr<CheckedSystem>, std::string> CheckedSystem::open(c
     // Without it nothing has run there since the boot.
     if (const Errno failure = root->openRuntimeDirectory(); failure && failure != ENOENT)
         return std::unexpected("cannot open the daemon's runtime directory: " + std::string(failure.text()));
-    auto configured = platform::configuredUsers(*root, platform::LinuxPasswordDatabase(*root));
-    if (!configured)
-        return std::unexpected(std::move(configured).error());
-    return std::unique_ptr<CheckedSystem>(new CheckedSystem(std::move(*root), std::move(*configured)));
+    auto configured = TRY(platform::configuredUsers(*root, platform::LinuxPasswordDatabase(*root)));
+    return std::unique_ptr<CheckedSystem>(new CheckedSystem(std::move(*root), std::move(configured)));
 }
 
 CheckedSystem::CheckedSystem(platform::SystemRoot root, ipc::ConfiguredUsers configured)

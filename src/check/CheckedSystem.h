@@ -12,6 +12,7 @@
 #include "os/Openat2.h"
 #include "os/SystemRoot.h"
 #include "platform/Disk.h"
+#include "platform/Errno.h"
 #include "platform/PlatformLog.h"
 #include "store/StorePlaces.h"
 
@@ -28,27 +29,27 @@ namespace zor::check {
 
 class ReadOnlyDisk final : public platform::Disk {
 public:
-    int makeDirectory(int, const char*, mode_t) override { return -EROFS; }
-    int createFile(int, const char*, mode_t) override { return -EROFS; }
-    int makeSymbolicLink(const char*, int, const char*) override { return -EROFS; }
-    int makeHardLink(int, const char*, int, const char*) override { return -EROFS; }
-    int makeFifo(int, const char*, mode_t) override { return -EROFS; }
-    int rename(int, const char*, int, const char*, unsigned) override { return -EROFS; }
-    int unlinkFile(int, const char*) override { return -EROFS; }
-    int removeDirectory(int, const char*) override { return -EROFS; }
-    int changeMode(int, mode_t) override { return -EROFS; }
-    int changeOwner(int, uid_t, gid_t) override { return -EROFS; }
-    int changeOwnerOf(int, const char*, uid_t, gid_t) override { return -EROFS; }
-    int setTimes(int, const timespec&, const timespec&) override { return -EROFS; }
-    int setAttribute(int, const char*, std::span<const std::uint8_t>) override { return -EROFS; }
-    int setInodeFlags(int, int) override { return -EROFS; }
-    int write(int, std::span<const std::uint8_t>) override { return -EROFS; }
-    int cloneData(int, int) override { return -EROFS; }
-    ssize_t copyData(int, int, std::size_t) override { return -EROFS; }
-    int sync(int) override { return -EROFS; }
-    int syncFileSystem(int) override { return -EROFS; }
-    int orderData(int) override { return -EROFS; }
-    [[nodiscard]] ssize_t read(int fd, std::span<std::uint8_t> bytes) override { return platform::readOnce(fd, bytes); }
+    Errno makeDirectory(int, const char*, mode_t) override { return Errno(EROFS); }
+    ErrnoOr<platform::FileDescriptor> createFile(int, const char*, mode_t) override { return Errno(EROFS); }
+    Errno makeSymbolicLink(const char*, int, const char*) override { return Errno(EROFS); }
+    Errno makeHardLink(int, const char*, int, const char*) override { return Errno(EROFS); }
+    Errno makeFifo(int, const char*, mode_t) override { return Errno(EROFS); }
+    Errno rename(int, const char*, int, const char*, unsigned) override { return Errno(EROFS); }
+    Errno unlinkFile(int, const char*) override { return Errno(EROFS); }
+    Errno removeDirectory(int, const char*) override { return Errno(EROFS); }
+    Errno changeMode(int, mode_t) override { return Errno(EROFS); }
+    Errno changeOwner(int, uid_t, gid_t) override { return Errno(EROFS); }
+    Errno changeOwnerOf(int, const char*, uid_t, gid_t) override { return Errno(EROFS); }
+    Errno setTimes(int, const timespec&, const timespec&) override { return Errno(EROFS); }
+    Errno setAttribute(int, const char*, std::span<const std::uint8_t>) override { return Errno(EROFS); }
+    Errno setInodeFlags(int, int) override { return Errno(EROFS); }
+    Errno write(int, std::span<const std::uint8_t>) override { return Errno(EROFS); }
+    Errno cloneData(int, int) override { return Errno(EROFS); }
+    ErrnoOr<std::size_t> copyData(int, int, std::size_t) override { return Errno(EROFS); }
+    Errno sync(int) override { return Errno(EROFS); }
+    Errno syncFileSystem(int) override { return Errno(EROFS); }
+    Errno orderData(int) override { return Errno(EROFS); }
+    ErrnoOr<std::size_t> read(int fd, std::span<std::uint8_t> bytes) override { return platform::readOnce(fd, bytes); }
     [[nodiscard]] bool hidesNames(int directory) override { return platform::hidesNames(directory); }
 };
 

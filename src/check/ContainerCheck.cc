@@ -194,7 +194,7 @@ void ContainerCheck::checkEntry(ClassDirectory& directory, const MetadataReader&
 void ContainerCheck::checkMisshapen(const ClassDirectory& directory, const FileURL& url, bool nameAcceptable) {
     struct stat status{};
     const std::string name(url.lastPathComponent());
-    const bool isLink = fs::statusOfName(directory.descriptor, name.c_str(), status) == 0 && S_ISLNK(status.st_mode);
+    const bool isLink = !fs::statusOfName(directory.descriptor, name.c_str(), status) && S_ISLNK(status.st_mode);
     const std::string what =
         isLink ? "is a link where only containers belong" : "is no directory where only containers belong";
     // A boot removes what has another name than containers have; what has one it leaves, for it cannot look inside.
@@ -217,7 +217,7 @@ std::shared_ptr<ZORMetadata> ContainerCheck::readRecord(const ClassDirectory& di
     struct stat status{};
     if (fs::statusOfName(container, names::metadataFile, status) == ENOENT) {
         // One that has gone altogether was read a moment too late.
-        if (fs::statusOfName(directory.descriptor, name, status) == 0) {
+        if (!fs::statusOfName(directory.descriptor, name, status)) {
             const FileURL url = directory.url.appendingDirectory(name);
             constexpr const char* what = "has no metadata file";
             Finding& finding =
@@ -240,7 +240,7 @@ void ContainerCheck::addRefused(const ClassDirectory& directory, const char* nam
     if (cause && cause->isPosix(EPERM))
         what = "has a metadata file that is not the daemon's alone: its owner, its permissions or a second name";
     else if (cause)
-        what += std::string(": ") + errorText(cause->code());
+        what += std::string(": ") + Errno(cause->code()).text();
     const bool elsewhere = refusal.rule == MetadataRule::user || refusal.rule == MetadataRule::place;
     if (const auto right = elsewhere ? rightPlace(directory, name) : std::nullopt)
         what += "; it belongs in " + look_.device().belowRoot(*right);
@@ -426,7 +426,7 @@ void ContainerCheck::checkNamesInside(const Container& container, const Containe
                                               [&](const char* final) { return fs::isDirectoryLeftover(text, final); });
         struct stat status{};
         // Programs have such names too; one that still is the daemon's own was not given away.
-        if (!half || fs::statusOfName(container.descriptor, name, status) != 0 || !S_ISDIR(status.st_mode) ||
+        if (!half || fs::statusOfName(container.descriptor, name, status) || !S_ISDIR(status.st_mode) ||
             status.st_uid != ::geteuid() || (layout.subdirectoryOwner == status.st_uid && look_.device().ownersCount()))
             return;
         describe(addDirectoryLeftover(container.url, text), container);

@@ -28,7 +28,7 @@ void Look::addUser(std::uint32_t userId) {
     if (home)
         system_.fileManager().resolver().fence(*home, fs::MountFence::Kind::home);
     struct stat status{};
-    const Errno error = home ? Errno(system_.fileManager().resolver().status(*home, status)) : home.error();
+    const Errno error = home ? system_.fileManager().resolver().status(*home, status) : home.error();
     if (error == ENOENT && entry)
         homeless_.insert(userId);
     if (!error && system_.fileManager().resolver().status(StorePlaces::userBaseDirectory(*home), status) == ENOENT)
@@ -66,7 +66,7 @@ void Look::addWrongShape(const FileURL& url) {
     for (std::size_t end = path.find('/', rootBytes + 1);; end = path.find('/', end + 1)) {
         const FileURL prefix = FileURL::directory(path.substr(0, end));
         struct stat status{};
-        if (system_.fileManager().resolver().status(prefix, status) == 0 && !S_ISDIR(status.st_mode)) {
+        if (!system_.fileManager().resolver().status(prefix, status) && !S_ISDIR(status.st_mode)) {
             if (misshapen_.insert(prefix.path()).second)
                 addForPerson(FindingCode::wrongShape, prefix,
                              S_ISLNK(status.st_mode) ? "is a link where a directory belongs"
@@ -105,8 +105,8 @@ void Look::forEachName(int directory, const FileURL& url, const std::function<vo
     fs::BulkDirectoryRead entries(directory, *buffer);
     while (const auto* entry = entries.next())
         function(entry->name);
-    if (entries.error() != 0)
-        addUnexamined(url, Errno(entries.error()));
+    if (entries.error())
+        addUnexamined(url, entries.error());
 }
 
 std::string Look::moveAside(const FileURL& url) const {

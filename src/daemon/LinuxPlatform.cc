@@ -1,13 +1,13 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/LinuxPlatform.h"
 
+#include "base/Try.h"
 #include "fs/AtomicFile.h"
 #include "identity/UserConfiguration.h"
 #include "os/Names.h"
 
 #include <algorithm>
 #include <cerrno>
-#include <cstring>
 #include <span>
 #include <unistd.h>
 
@@ -32,7 +32,7 @@ Errno tellUsers(Disk& disk, int runtimeDirectory, const ipc::UserNumbers& number
     const auto there = fs::readOwnedFile(disk, runtimeDirectory, names::usersFile, bytes.size());
     if (there && std::ranges::equal(*there, bytes))
         return Errno();
-    return Errno(-fs::replaceFileDurably(disk, runtimeDirectory, names::usersFile, usersFileMode, bytes));
+    return fs::replaceFileDurably(disk, runtimeDirectory, names::usersFile, usersFileMode, bytes);
 }
 
 } // namespace
@@ -56,13 +56,11 @@ std::expected<std::unique_ptr<LinuxPlatform>, std::string> LinuxPlatform::open(O
         return std::unexpected("another daemon serves the root " + root->canonicalPath());
     if (!lock)
         return cannot("cannot lock " + runtime + "/" + names::lockFile, lock.error());
-    auto users = configuredUsers(*root, LinuxPasswordDatabase(*root));
-    if (!users)
-        return std::unexpected(std::move(users).error());
-    if (const Errno failed = tellUsers(disk, root->runtimeDirectory(), users->numbers))
+    auto users = TRY(configuredUsers(*root, LinuxPasswordDatabase(*root)));
+    if (const Errno failed = tellUsers(disk, root->runtimeDirectory(), users.numbers))
         return cannot("cannot write " + runtime + "/" + names::usersFile, failed);
     return std::unique_ptr<LinuxPlatform>(
-        new LinuxPlatform(std::move(*root), std::move(*lock), std::move(*users), std::move(options)));
+        new LinuxPlatform(std::move(*root), std::move(*lock), std::move(users), std::move(options)));
 }
 
 LinuxPlatform::LinuxPlatform(SystemRoot root, DaemonLock lock, ipc::ConfiguredUsers users, Options options)

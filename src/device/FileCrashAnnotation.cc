@@ -27,17 +27,11 @@ Errno FileCrashAnnotation::replaceFile(std::string_view message) {
     const FileDescriptor directory = TRY(openBeneath(root_.descriptor(), names::logDirectory, O_RDONLY | O_DIRECTORY));
     const std::string temporary = std::string(".") + names::crashFile;
     (void)disk_.unlinkFile(directory.get(), temporary.c_str());
-    const FileDescriptor file(disk_.createFile(directory.get(), temporary.c_str(), fileMode));
-    if (!file.valid())
-        return Errno(EIO);
-    int result = disk_.write(file.get(), {reinterpret_cast<const std::uint8_t*>(message.data()), message.size()});
-    if (result == 0)
-        result = disk_.sync(file.get());
-    if (result == 0)
-        result = disk_.rename(directory.get(), temporary.c_str(), directory.get(), names::crashFile, 0);
-    if (result == 0)
-        result = disk_.sync(directory.get());
-    return Errno(-result);
+    const FileDescriptor file = TRY(disk_.createFile(directory.get(), temporary.c_str(), fileMode));
+    TRY(disk_.write(file.get(), {reinterpret_cast<const std::uint8_t*>(message.data()), message.size()}));
+    TRY(disk_.sync(file.get()));
+    TRY(disk_.rename(directory.get(), temporary.c_str(), directory.get(), names::crashFile, 0));
+    return disk_.sync(directory.get());
 }
 
 } // namespace zor::platform

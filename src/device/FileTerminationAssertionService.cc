@@ -88,9 +88,9 @@ Errno FileTerminationAssertionService::hold(const std::string& identifier, Termi
 
 ErrnoOr<FileDescriptor> FileTerminationAssertionService::openDirectory() {
     const char* const name = names::assertionDirectory;
-    const int made = disk_.makeDirectory(root_.runtimeDirectory(), name, directoryMode);
-    if (made < 0 && made != -EEXIST)
-        return Errno(-made);
+    const Errno made = disk_.makeDirectory(root_.runtimeDirectory(), name, directoryMode);
+    if (made && made != EEXIST)
+        return made;
     return openBeneath(root_.runtimeDirectory(), name, O_RDONLY | O_DIRECTORY);
 }
 
@@ -99,17 +99,14 @@ ErrnoOr<FileDescriptor> FileTerminationAssertionService::lockFile(const std::str
     const std::string name = percentEncode(identifier);
     const FileDescriptor directory = TRY(openDirectory());
     // A file that an earlier daemon left may be open in a launcher that waits on it; a new file cannot be.
-    const int removed = disk_.unlinkFile(directory.get(), name.c_str());
-    if (removed < 0 && removed != -ENOENT)
-        return Errno(-removed);
-    const int created = disk_.createFile(directory.get(), name.c_str(), fileMode);
-    if (created < 0)
-        return Errno(-created);
-    FileDescriptor file(created);
+    const Errno removed = disk_.unlinkFile(directory.get(), name.c_str());
+    if (removed && removed != ENOENT)
+        return removed;
+    FileDescriptor file = TRY(disk_.createFile(directory.get(), name.c_str(), fileMode));
     Errno failure = lockWithin(file.get());
     if (!failure) {
         const std::string text = std::to_string(static_cast<unsigned>(reason));
-        failure = Errno(-disk_.write(file.get(), {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()}));
+        failure = disk_.write(file.get(), {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()});
     }
     if (failure) {
         (void)disk_.unlinkFile(directory.get(), name.c_str());

@@ -2,6 +2,7 @@
 #include "device/LinkSandboxUserState.h"
 
 #include "base/Format.h"
+#include "base/Try.h"
 #include "os/Names.h"
 #include "os/Openat2.h"
 
@@ -62,14 +63,12 @@ ErrnoOr<FileDescriptor> LinkSandboxUserState::openDirectory(int parent, const ch
     auto opened = openBeneath(parent, name, flags);
     if (opened || opened.error() != ENOENT || missing == Missing::fail)
         return opened;
-    const int made = disk_.makeDirectory(parent, name, directoryMode);
-    if (made < 0 && made != -EEXIST)
-        return Errno(-made);
+    const Errno made = disk_.makeDirectory(parent, name, directoryMode);
+    if (made && made != EEXIST)
+        return made;
     opened = openBeneath(parent, name, flags);
-    if (opened && made == 0) {
-        if (const int changed = disk_.changeMode(opened->get(), directoryMode); changed < 0)
-            return Errno(-changed);
-    }
+    if (opened && !made)
+        TRY(disk_.changeMode(opened->get(), directoryMode));
     return opened;
 }
 
@@ -95,24 +94,24 @@ Errno LinkSandboxUserState::setMapping(std::uint32_t userId, SandboxItemType typ
     if (!path) {
         if (!directory)
             return directory.error() == ENOENT ? Errno() : directory.error();
-        const int removed = disk_.unlinkFile(directory->get(), name.c_str());
-        return removed == -ENOENT ? Errno() : Errno(-removed);
+        const Errno removed = disk_.unlinkFile(directory->get(), name.c_str());
+        return removed == ENOENT ? Errno() : removed;
     }
     if (!directory)
         return directory.error();
     const std::string temporary = ".new-" + std::to_string(temporaryNames_.fetch_add(1, std::memory_order_relaxed));
-    int made = disk_.makeSymbolicLink(path->c_str(), directory->get(), temporary.c_str());
-    if (made == -EEXIST) {
+    Errno made = disk_.makeSymbolicLink(path->c_str(), directory->get(), temporary.c_str());
+    if (made == EEXIST) {
         // Left by a daemon that was killed here.
         (void)disk_.unlinkFile(directory->get(), temporary.c_str());
         made = disk_.makeSymbolicLink(path->c_str(), directory->get(), temporary.c_str());
     }
-    if (made < 0)
-        return Errno(-made);
-    const int renamed = disk_.rename(directory->get(), temporary.c_str(), directory->get(), name.c_str(), 0);
-    if (renamed < 0)
+    if (made)
+        return made;
+    const Errno renamed = disk_.rename(directory->get(), temporary.c_str(), directory->get(), name.c_str(), 0);
+    if (renamed)
         (void)disk_.unlinkFile(directory->get(), temporary.c_str());
-    return Errno(-renamed);
+    return renamed;
 }
 
 unsigned LinkSandboxUserState::removeDanglingMappings(const std::function<bool(std::uint32_t userId)>& mayConclude,
@@ -125,7 +124,7 @@ unsigned LinkSandboxUserState::removeDanglingMappings(const std::function<bool(s
             if (isSandboxLeftover(name))
                 (void)disk_.unlinkFile(directory.descriptor, name.c_str());
             else if (concludes && isDanglingSandboxLink(root_, directory.descriptor, name.c_str(), isGone) &&
-                     disk_.unlinkFile(directory.descriptor, name.c_str()) == 0)
+                     !disk_.unlinkFile(directory.descriptor, name.c_str()))
                 ++removed;
         }
     });

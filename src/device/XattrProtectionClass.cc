@@ -70,11 +70,11 @@ Errno XattrProtectionClass::setClass(int fd, int protectionClass) {
             return Errno(EPERM);
     }
     const std::string text = std::to_string(protectionClass);
-    const int set =
+    const Errno set =
         disk_.setAttribute(fd, attribute_, {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()});
-    if (set == -EOPNOTSUPP)
+    if (set == EOPNOTSUPP)
         supported_.store(false, std::memory_order_relaxed);
-    return neverLocked(Errno(-set));
+    return neverLocked(set);
 }
 
 } // namespace zor::platform

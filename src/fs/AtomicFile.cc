@@ -2,6 +2,7 @@
 #include "fs/AtomicFile.h"
 
 #include "base/Assert.h"
+#include "base/Try.h"
 #include "os/FileDescriptor.h"
 #include "os/Openat2.h"
 
@@ -48,84 +49,78 @@ std::string uniqueName(std::string prefix) {
     return prefix;
 }
 
-int writeNewFile(platform::Disk& disk, int directory, const char* name, mode_t mode,
-                 std::span<const std::uint8_t> bytes) {
-    FileDescriptor file(disk.createFile(directory, name, mode));
-    if (!file.valid())
-        return file.get();
+ErrnoOr<FileDescriptor> writeNewFile(platform::Disk& disk, int directory, const char* name, mode_t mode,
+                                     std::span<const std::uint8_t> bytes) {
+    FileDescriptor file = TRY(disk.createFile(directory, name, mode));
     // The process's umask, or what the directory hands down, may have changed it.
     struct stat made{};
-    int status = ::fstat(file.get(), &made) != 0 ? -errno : 0;
-    if (status == 0 && (made.st_mode & permissionBits) != mode)
-        status = disk.changeMode(file.get(), mode);
-    if (status == 0)
-        status = disk.write(file.get(), bytes);
-    return status < 0 ? status : file.release();
+    if (::fstat(file.get(), &made) != 0)
+        return Errno::last();
+    if ((made.st_mode & permissionBits) != mode)
+        TRY(disk.changeMode(file.get(), mode));
+    TRY(disk.write(file.get(), bytes));
+    return file;
 }
 
-int replaceFileDurably(platform::Disk& disk, int directory, const std::string& name, mode_t mode,
-                       std::span<const std::uint8_t> bytes, const std::function<int(int file)>& prepare) {
+Errno replaceFileDurably(platform::Disk& disk, int directory, const std::string& name, mode_t mode,
+                         std::span<const std::uint8_t> bytes, const std::function<Errno(int file)>& prepare) {
     ZOR_ASSERT(!name.empty() && name.find('/') == std::string::npos);
     const std::string prefix = "." + name + std::string(temporaryMark);
     std::string temporary = prefix + std::string(usualSuffix);
-    int descriptor = writeNewFile(disk, directory, temporary.c_str(), mode, bytes);
-    if (descriptor == -EEXIST && disk.unlinkFile(directory, temporary.c_str()) == 0)
-        descriptor = writeNewFile(disk, directory, temporary.c_str(), mode, bytes);
+    const auto write = [&] { return writeNewFile(disk, directory, temporary.c_str(), mode, bytes); };
+    auto file = write();
+    const auto isTaken = [&] { return !file && file.error() == EEXIST; };
+    if (isTaken() && !disk.unlinkFile(directory, temporary.c_str()))
+        file = write();
     // The directory's owner holds that name.
-    for (int tried = 0; descriptor == -EEXIST && tried < namesTriedMax; ++tried) {
+    for (int tried = 0; isTaken() && tried < namesTriedMax; ++tried) {
         temporary = uniqueName(prefix);
-        descriptor = writeNewFile(disk, directory, temporary.c_str(), mode, bytes);
+        file = write();
     }
-    const FileDescriptor file(descriptor < 0 ? -1 : descriptor);
-    int status = descriptor < 0 ? descriptor : 0;
-    if (status == 0 && prepare)
-        status = prepare(file.get());
-    if (status == 0)
-        status = disk.sync(file.get());
-    if (status == 0)
-        status = disk.rename(directory, temporary.c_str(), directory, name.c_str(), 0);
-    if (status < 0) {
-        if (descriptor != -EEXIST)
-            disk.unlinkFile(directory, temporary.c_str());
-        return status;
+    Errno error = file ? Errno() : file.error();
+    if (!error && prepare)
+        error = prepare(file->get());
+    if (!error)
+        error = disk.sync(file->get());
+    if (!error)
+        error = disk.rename(directory, temporary.c_str(), directory, name.c_str(), 0);
+    if (error) {
+        if (!isTaken())
+            (void)disk.unlinkFile(directory, temporary.c_str());
+        return error;
     }
     // The directory descriptor may be O_PATH, which cannot be synced.
-    const auto listing = platform::openBeneath(directory, ".", O_RDONLY | O_DIRECTORY);
-    return listing ? disk.sync(listing->get()) : -listing.error().number();
+    return disk.sync(TRY(platform::openBeneath(directory, ".", O_RDONLY | O_DIRECTORY)).get());
 }
 
 namespace {
 
 /// EPERM for a file that somebody else may have written.
-int judge(const struct stat& status, std::size_t bytesMax, std::optional<uid_t> formerOwner) {
+Errno judge(const struct stat& status, std::size_t bytesMax, std::optional<uid_t> formerOwner) {
     const bool trustedOwner = status.st_uid == 0 || status.st_uid == ::geteuid() || status.st_uid == formerOwner;
     if (!S_ISREG(status.st_mode) || status.st_nlink != 1 || !trustedOwner || (status.st_mode & (S_IWGRP | S_IWOTH)))
-        return EPERM;
-    return static_cast<std::size_t>(status.st_size) > bytesMax ? EFBIG : 0;
+        return Errno(EPERM);
+    return static_cast<std::size_t>(status.st_size) > bytesMax ? Errno(EFBIG) : Errno();
 }
 
 } // namespace
 
 ErrnoOr<plist::Data> readOwnedFile(platform::Disk& disk, int directory, const char* path, std::size_t bytesMax,
                                    std::optional<uid_t> formerOwner) {
-    const auto file = platform::openBeneathOnMount(directory, path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
-    if (!file)
-        return file.error();
+    const FileDescriptor file =
+        TRY(platform::openBeneathOnMount(directory, path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY));
     struct stat status{};
-    if (::fstat(file->get(), &status) != 0)
+    if (::fstat(file.get(), &status) != 0)
         return Errno::last();
-    if (const int refused = judge(status, bytesMax, formerOwner))
-        return std::unexpected(refused);
+    TRY(judge(status, bytesMax, formerOwner));
     // One that grows meanwhile is read to its old size.
     plist::Data bytes(static_cast<std::size_t>(status.st_size));
     std::size_t length = 0;
     while (length < bytes.size()) {
-        const ssize_t count = disk.read(file->get(), std::span(bytes).subspan(length));
-        if (count < 0)
-            return std::unexpected(static_cast<int>(-count));
+        const std::size_t count = TRY(disk.read(file.get(), std::span(bytes).subspan(length)));
         if (count == 0)
             break;
-        length += static_cast<std::size_t>(count);
+        length += count;
     }
     bytes.resize(length);
     return bytes;

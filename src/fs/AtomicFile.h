@@ -2,6 +2,7 @@
 // Small files: replaced in one step, and read where others may write.
 #pragma once
 
+#include "os/FileDescriptor.h"
 #include "platform/Disk.h"
 #include "platform/Errno.h"
 #include "plist/Value.h"
@@ -24,20 +25,17 @@ namespace zor::fs {
 // of the same target removes it. Any thread; writers of one target are serialised by their
 // callers.
 
-/// 0, or a negative errno with the target untouched (unless only the last directory sync failed).
-/// `mode` is set whatever the process's mask; the file belongs to the daemon. `prepare` does more to the new file
-/// before it is synced: 0 or a negative errno.
-[[nodiscard]] int replaceFileDurably(platform::Disk& disk, int directory, const std::string& name, mode_t mode,
-                                     std::span<const std::uint8_t> bytes,
-                                     const std::function<int(int file)>& prepare = nullptr);
+/// An error leaves the target untouched (unless only the last directory sync failed). `mode` is set whatever the
+/// process's mask; the file belongs to the daemon. `prepare` does more to the new file before it is synced.
+Errno replaceFileDurably(platform::Disk& disk, int directory, const std::string& name, mode_t mode,
+                         std::span<const std::uint8_t> bytes, const std::function<Errno(int file)>& prepare = nullptr);
 
 /// Whether a file of this name is what a write that was cut short left.
 [[nodiscard]] bool isWriteLeftover(std::string_view name);
 
-/// A new file with the content, not synced. Its descriptor, or a negative errno with nothing left behind but perhaps
-/// the file.
-[[nodiscard]] int writeNewFile(platform::Disk& disk, int directory, const char* name, mode_t mode,
-                               std::span<const std::uint8_t> bytes);
+/// A new file with the content, not synced. An error leaves nothing behind but perhaps the file.
+[[nodiscard]] ErrnoOr<platform::FileDescriptor> writeNewFile(platform::Disk& disk, int directory, const char* name,
+                                                             mode_t mode, std::span<const std::uint8_t> bytes);
 
 /// `prefix` and six random characters.
 [[nodiscard]] std::string uniqueName(std::string prefix);
@@ -47,7 +45,7 @@ namespace zor::fs {
 /// Largest file of one container: its info values have to fit.
 inline constexpr std::size_t metadataFileBytesMax = std::size_t{1} << 20;
 
-/// The whole of a file, or an errno. `path` is relative to `directory` and resolved without following a link.
+/// The whole of a file. `path` is relative to `directory` and resolved without following a link.
 ///
 /// The file must be regular, have one link, belong to root or the daemon's user (or to `formerOwner`, for files of an
 /// older system), not be writable by group or others, and hold at most `bytesMax`; else EPERM or EFBIG. Opening cannot

@@ -19,7 +19,7 @@ bool BulkDirectoryRead::fill() {
     while (count < 0 && errno == EINTR);
     // A directory that is no longer linked anywhere answers ENOENT.
     if (count < 0 && errno != ENOENT)
-        error_ = errno;
+        error_ = Errno::last();
     used_ = 0;
     filled_ = count > 0 ? static_cast<std::size_t>(count) : 0;
     return filled_ > 0;
@@ -27,11 +27,11 @@ bool BulkDirectoryRead::fill() {
 
 const BulkDirectoryRead::Entry* BulkDirectoryRead::next() {
     constexpr std::size_t nameOffset = offsetof(dirent64, d_name);
-    while (used_ < filled_ || (error_ == 0 && fill())) {
+    while (used_ < filled_ || (!error_ && fill())) {
         const auto* record = reinterpret_cast<const dirent64*>(buffer_.data() + used_);
         const std::size_t recordBytes = record->d_reclen;
         if (recordBytes <= nameOffset || recordBytes > filled_ - used_) {
-            error_ = EIO;
+            error_ = Errno(EIO);
             break;
         }
         used_ += recordBytes;
@@ -39,7 +39,7 @@ const BulkDirectoryRead::Entry* BulkDirectoryRead::next() {
         const char* name = record->d_name;
         const std::size_t nameBytes = ::strnlen(name, recordBytes - nameOffset);
         if (nameBytes == recordBytes - nameOffset) {
-            error_ = EIO;
+            error_ = Errno(EIO);
             break;
         }
         if (name[0] == '.' && (nameBytes == 1 || (nameBytes == 2 && name[1] == '.')))
@@ -51,15 +51,13 @@ const BulkDirectoryRead::Entry* BulkDirectoryRead::next() {
     return nullptr;
 }
 
-int BulkDirectoryRead::seek(off_t position) {
+Errno BulkDirectoryRead::seek(off_t position) {
     filled_ = used_ = 0;
-    error_ = 0;
+    error_ = Errno();
     position_ = position;
-    if (::lseek(directory_, position, SEEK_SET) < 0) {
-        error_ = errno;
-        return -error_;
-    }
-    return 0;
+    if (::lseek(directory_, position, SEEK_SET) < 0)
+        error_ = Errno::last();
+    return error_;
 }
 
 } // namespace zor::fs

@@ -6,6 +6,8 @@
 // the buffer belong to the caller and have to outlive the reader. One thread at a time.
 #pragma once
 
+#include "platform/Errno.h"
+
 #include <array>
 #include <cstddef>
 #include <cstdint>
@@ -33,13 +35,13 @@ public:
 
     /// The next entry, or nullptr at the end and after an error.
     const Entry* next();
-    /// 0, or the errno of the read that ended the entries.
-    [[nodiscard]] int error() const { return error_; }
+    /// Of the read that ended the entries.
+    [[nodiscard]] Errno error() const { return error_; }
     /// The place at which the entry after the last one given begins. Good for seek(), on this or another descriptor of
     /// the same directory.
     [[nodiscard]] off_t position() const { return position_; }
-    /// Goes on at a position; 0 is the beginning. 0 or -errno.
-    int seek(off_t position);
+    /// Goes on at a position; 0 is the beginning.
+    Errno seek(off_t position);
 
 private:
     bool fill();
@@ -49,7 +51,7 @@ private:
     std::size_t filled_ = 0;
     std::size_t used_ = 0;
     off_t position_ = 0;
-    int error_ = 0;
+    Errno error_;
     Entry entry_;
 };
 

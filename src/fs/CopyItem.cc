@@ -1,6 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/CopyItem.h"
 
+#include "base/Try.h"
+
 #include <algorithm>
 #include <array>
 #include <cerrno>
@@ -35,14 +37,14 @@ bool CopyAttributes::skips(std::string_view name) const {
 
 /// Whether the copy may go without an attribute: the destination's file system does not have its kind, or only root may
 /// set it.
-bool CopyAttributes::mayLack(std::string_view name, int error) const {
+bool CopyAttributes::mayLack(std::string_view name, Errno error) const {
     if (error == EOPNOTSUPP)
         return true;
     const bool isUser = name.starts_with("user.") || isAcl(name);
     return !isRoot_ && !isUser && (error == EPERM || error == EACCES);
 }
 
-int CopyAttributes::list(int file) {
+Errno CopyAttributes::list(int file) {
     // Nearly every file answers with nothing, which needs no buffer.
     ssize_t length = ::flistxattr(file, nullptr, 0);
     for (int attempt = 0; length > 0 && attempt < attemptsMax; ++attempt) {
@@ -52,21 +54,20 @@ int CopyAttributes::list(int file) {
             break;
     }
     names_.resize(length > 0 ? static_cast<std::size_t>(length) : 0);
-    return length < 0 && errno != EOPNOTSUPP ? -errno : 0;
+    return length < 0 && errno != EOPNOTSUPP ? Errno::last() : Errno();
 }
 
-int CopyAttributes::copyAttribute(int from, int to, const char* name) {
+Errno CopyAttributes::copyAttribute(int from, int to, const char* name) {
     value_.resize(XATTR_SIZE_MAX);
     const ssize_t length = ::fgetxattr(from, name, value_.data(), value_.size());
     if (length < 0)
-        return errno == ENODATA || mayLack(name, errno) ? 0 : -errno;
-    const int result = disk_.setAttribute(to, name, std::span(value_).first(static_cast<std::size_t>(length)));
-    return result < 0 && mayLack(name, -result) ? 0 : result;
+        return errno == ENODATA || mayLack(name, Errno::last()) ? Errno() : Errno::last();
+    const Errno set = disk_.setAttribute(to, name, std::span(value_).first(static_cast<std::size_t>(length)));
+    return mayLack(name, set) ? Errno() : set;
 }
 
-int CopyAttributes::copy(int from, int to, const struct stat& status, mode_t mode) {
-    if (const int listed = list(from); listed < 0)
-        return listed;
+Errno CopyAttributes::copy(int from, int to, const struct stat& status, mode_t mode) {
+    TRY(list(from));
     // Attributes while the file is still writable for us, then the owner (which takes bits from the mode), then the
     // mode, then the lists that refine it.
     bool hasAcl = false;
@@ -75,34 +76,27 @@ int CopyAttributes::copy(int from, int to, const struct stat& status, mode_t mod
         hasAcl = hasAcl || isAcl(name);
         if (isAcl(name) || skips(name))
             continue;
-        if (const int result = copyAttribute(from, to, name); result < 0)
-            return result;
+        TRY(copyAttribute(from, to, name));
     }
-    if (const int result = disk_.changeOwner(to, status.st_uid, status.st_gid); result < 0)
-        return result;
-    if (const int result = disk_.changeMode(to, mode); result < 0)
-        return result;
+    TRY(disk_.changeOwner(to, status.st_uid, status.st_gid));
+    TRY(disk_.changeMode(to, mode));
     if (hasAcl)
         for (const char* name : {accessAcl, defaultAcl})
-            if (const int result = copyAttribute(from, to, name); result < 0)
-                return result;
-    if (const int result = dropInheritedAcl(from, to, mode); result < 0)
-        return result;
+            TRY(copyAttribute(from, to, name));
+    TRY(dropInheritedAcl(from, to, mode));
     return disk_.setTimes(to, status.st_atim, status.st_mtim);
 }
 
-int CopyAttributes::giveBasic(int to, const struct stat& status, mode_t mode) {
-    if (const int result = disk_.changeOwner(to, status.st_uid, status.st_gid); result < 0)
-        return result;
-    if (const int result = disk_.changeMode(to, mode); result < 0)
-        return result;
+Errno CopyAttributes::giveBasic(int to, const struct stat& status, mode_t mode) {
+    TRY(disk_.changeOwner(to, status.st_uid, status.st_gid));
+    TRY(disk_.changeMode(to, mode));
     return disk_.setTimes(to, status.st_atim, status.st_mtim);
 }
 
 /// Takes an access control list away that the copy inherited and the source does not have.
-int CopyAttributes::dropInheritedAcl(int from, int to, mode_t mode) {
+Errno CopyAttributes::dropInheritedAcl(int from, int to, mode_t mode) {
     if (::fgetxattr(to, accessAcl, nullptr, 0) <= 0 || ::fgetxattr(from, accessAcl, nullptr, 0) > 0)
-        return 0;
+        return Errno();
     // A list that says no more than the mode is kept as the mode alone.
     struct MinimalAcl {
         posix_acl_xattr_header header;
@@ -118,9 +112,9 @@ int CopyAttributes::dropInheritedAcl(int from, int to, mode_t mode) {
     return disk_.setAttribute(to, accessAcl, {bytes, sizeof acl});
 }
 
-int CopyAttributes::dropInheritedDefaultAcl(int directory) {
+Errno CopyAttributes::dropInheritedDefaultAcl(int directory) {
     if (::fgetxattr(directory, defaultAcl, nullptr, 0) <= 0)
-        return 0;
+        return Errno();
     const posix_acl_xattr_header none{.a_version = POSIX_ACL_XATTR_VERSION};
     const auto* bytes = reinterpret_cast<const std::uint8_t*>(&none);
     return disk_.setAttribute(directory, defaultAcl, {bytes, sizeof none});
@@ -134,30 +128,31 @@ constexpr off_t kernelCopyBytesMax = 64 * 1024 * 1024;
 constexpr off_t blockBytes = 512;
 
 /// The call is not for this file or this pair of file systems; there is another way.
-bool refused(ssize_t result) {
-    return result == -EOPNOTSUPP || result == -EXDEV || result == -EINVAL || result == -ENOSYS || result == -ENOTTY;
+bool refused(Errno error) {
+    return error == EOPNOTSUPP || error == EXDEV || error == EINVAL || error == ENOSYS || error == ENOTTY;
 }
 
 } // namespace
 
-int CopyData::copy(int from, int to, const struct stat& status) {
+Errno CopyData::copy(int from, int to, const struct stat& status) {
     if (status.st_size == 0)
-        return 0;
+        return Errno();
     if (!cloneRefused_) {
-        const int cloned = disk_.cloneData(from, to);
-        if (cloned == 0)
+        const Errno cloned = disk_.cloneData(from, to);
+        if (!cloned)
             return tell(status.st_size);
         if (!refused(cloned))
             return cloned;
         // EINVAL may be about this one file.
-        cloneRefused_ = cloned != -EINVAL;
+        cloneRefused_ = cloned != EINVAL;
     }
     if (status.st_blocks * blockBytes < status.st_size)
         return copyRuns(from, to, status.st_size);
-    return static_cast<int>(std::min<off_t>(copyRun(from, to, status.st_size), 0));
+    (void)TRY(copyRun(from, to, status.st_size));
+    return Errno();
 }
 
-int CopyData::copyRuns(int from, int to, off_t size) {
+Errno CopyData::copyRuns(int from, int to, off_t size) {
     off_t end = 0;
     while (end < size) {
         off_t data = ::lseek(from, end, SEEK_DATA);
@@ -170,63 +165,59 @@ int CopyData::copyRuns(int from, int to, off_t size) {
             break;
         hole = hole < 0 ? size : std::min(hole, size);
         if (::lseek(from, data, SEEK_SET) < 0 || ::lseek(to, data, SEEK_SET) < 0)
-            return -errno;
-        const off_t copied = copyRun(from, to, hole - data);
-        if (copied < 0)
-            return static_cast<int>(copied);
-        if (copied < hole - data)
-            return 0;
+            return Errno::last();
+        if (TRY(copyRun(from, to, hole - data)) < hole - data)
+            return Errno();
         end = hole;
     }
-    return end < size ? extend(from, to, size) : 0;
+    return end < size ? extend(from, to, size) : Errno();
 }
 
-off_t CopyData::copyRun(int from, int to, off_t bytes) {
+ErrnoOr<off_t> CopyData::copyRun(int from, int to, off_t bytes) {
     off_t copied = 0;
     while (copied < bytes) {
         if (!kernelCopyRefused_) {
-            const ssize_t count =
+            const auto count =
                 disk_.copyData(from, to, static_cast<std::size_t>(std::min(bytes - copied, kernelCopyBytesMax)));
-            if (count > 0) {
-                copied += count;
-                if (const int told = tell(count); told < 0)
-                    return told;
+            if (count && *count > 0) {
+                copied += static_cast<off_t>(*count);
+                TRY(tell(static_cast<off_t>(*count)));
                 continue;
             }
-            if (count < 0 && !refused(count))
-                return count;
+            if (!count && !refused(count.error()))
+                return count.error();
             // 0 is the end of the file, or a file system whose files have a content but no such call: reading tells.
-            kernelCopyRefused_ = count < 0;
+            kernelCopyRefused_ = !count;
         }
         buffer_.resize(bufferBytes);
         const std::size_t wanted = static_cast<std::size_t>(std::min<off_t>(bytes - copied, bufferBytes));
         const ssize_t count = ::read(from, buffer_.data(), wanted);
         if (count < 0 && errno == EINTR)
             continue;
-        if (count <= 0)
-            return count < 0 ? -errno : copied;
-        if (const int written = disk_.write(to, std::span(buffer_).first(static_cast<std::size_t>(count))); written < 0)
-            return written;
+        if (count < 0)
+            return Errno::last();
+        if (count == 0)
+            return copied;
+        TRY(disk_.write(to, std::span(buffer_).first(static_cast<std::size_t>(count))));
         copied += count;
-        if (const int told = tell(count); told < 0)
-            return told;
+        TRY(tell(count));
     }
     return copied;
 }
 
 /// The file ends with a hole: a last byte gives the copy its length.
-int CopyData::extend(int from, int to, off_t size) {
+Errno CopyData::extend(int from, int to, off_t size) {
     struct stat now{};
     if (::fstat(from, &now) != 0)
-        return -errno;
+        return Errno::last();
     size = std::min(size, now.st_size);
     const off_t length = ::lseek(to, 0, SEEK_END);
     if (length < 0)
-        return -errno;
+        return Errno::last();
     if (size <= length)
-        return 0;
+        return Errno();
     if (::lseek(to, size - 1, SEEK_SET) < 0)
-        return -errno;
+        return Errno::last();
     const std::array<std::uint8_t, 1> zero{};
     return disk_.write(to, zero);
 }

@@ -3,6 +3,7 @@
 #pragma once
 
 #include "platform/Disk.h"
+#include "platform/Errno.h"
 
 #include <cstdint>
 #include <functional>
@@ -21,21 +22,21 @@ class CopyAttributes {
 public:
     explicit CopyAttributes(platform::Disk& disk);
 
-    /// Both are open files or directories; `status` is of `from`, `mode` what the copy gets. 0 or -errno.
-    int copy(int from, int to, const struct stat& status, mode_t mode);
-    /// Owner, group, mode and times alone. 0 or -errno.
-    int giveBasic(int to, const struct stat& status, mode_t mode);
+    /// Both are open files or directories; `status` is of `from`, `mode` what the copy gets.
+    Errno copy(int from, int to, const struct stat& status, mode_t mode);
+    /// Owner, group, mode and times alone.
+    Errno giveBasic(int to, const struct stat& status, mode_t mode);
     /// A new directory takes over the default access control list of the one it is made in, and its content would in
     /// turn.
-    int dropInheritedDefaultAcl(int directory);
+    Errno dropInheritedDefaultAcl(int directory);
 
 private:
-    /// The names of the attributes of `file`, each followed by a NUL. 0 or -errno.
-    int list(int file);
-    int copyAttribute(int from, int to, const char* name);
-    int dropInheritedAcl(int from, int to, mode_t mode);
+    /// The names of the attributes of `file`, each followed by a NUL.
+    Errno list(int file);
+    Errno copyAttribute(int from, int to, const char* name);
+    Errno dropInheritedAcl(int from, int to, mode_t mode);
     [[nodiscard]] bool skips(std::string_view name) const;
-    [[nodiscard]] bool mayLack(std::string_view name, int error) const;
+    [[nodiscard]] bool mayLack(std::string_view name, Errno error) const;
 
     platform::Disk& disk_;
     const bool isRoot_;
@@ -48,20 +49,20 @@ private:
 
 class CopyData {
 public:
-    /// Told of each piece that was copied; what is not 0, a -errno, ends the copy.
-    using Copied = std::function<int(std::uint64_t bytes)>;
+    /// Told of each piece that was copied; an error ends the copy.
+    using Copied = std::function<Errno(std::uint64_t bytes)>;
     explicit CopyData(platform::Disk& disk, Copied copied = {}) : disk_(disk), copied_(std::move(copied)) {}
 
     /// Both files are open at their beginning, `to` is new. `status` is of `from`: not more than its size is copied,
-    /// however fast the file grows; where the data is shared, the whole file is. 0 or -errno.
-    int copy(int from, int to, const struct stat& status);
+    /// however fast the file grows; where the data is shared, the whole file is.
+    Errno copy(int from, int to, const struct stat& status);
 
 private:
-    int copyRuns(int from, int to, off_t size);
-    /// The bytes copied, fewer at the end of the file; or -errno.
-    off_t copyRun(int from, int to, off_t bytes);
-    int extend(int from, int to, off_t size);
-    [[nodiscard]] int tell(off_t bytes) const { return copied_ ? copied_(static_cast<std::uint64_t>(bytes)) : 0; }
+    Errno copyRuns(int from, int to, off_t size);
+    /// The bytes copied, fewer at the end of the file.
+    ErrnoOr<off_t> copyRun(int from, int to, off_t bytes);
+    Errno extend(int from, int to, off_t size);
+    Errno tell(off_t bytes) const { return copied_ ? copied_(static_cast<std::uint64_t>(bytes)) : Errno(); }
 
     platform::Disk& disk_;
     const Copied copied_;

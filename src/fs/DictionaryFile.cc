@@ -15,26 +15,28 @@ namespace zor {
 Result<plist::Data> serialisedFor(const FileURL& url, const plist::Dictionary& dictionary, std::size_t bytesMax) {
     plist::Data bytes;
     if (const auto done = plist::appendBinary(dictionary, bytes); !done)
-        return posixError(ZOR_HERE, EINVAL, "serialisation for %s failed: %s", url.c_str(), done.error().reason);
+        return posixError(ZOR_HERE, Errno(EINVAL), "serialisation for %s failed: %s", url.c_str(), done.error().reason);
     if (bytes.size() > bytesMax)
-        return posixError(ZOR_HERE, EFBIG, "write of %s failed: %zu bytes are more than the %zu that it may have",
-                          url.c_str(), bytes.size(), bytesMax);
+        return posixError(ZOR_HERE, Errno(EFBIG),
+                          "write of %s failed: %zu bytes are more than the %zu that it may have", url.c_str(),
+                          bytes.size(), bytesMax);
     return bytes;
 }
 
 Result<void> writeToURL(const plist::Dictionary& dictionary, const FileURL& url, std::uint32_t options,
                         std::size_t bytesMax, ZORFileManager& fileManager) {
     if (options != (writeAtomically | writeWithoutProtection))
-        return posixError(ZOR_HERE, EINVAL, "write of %s failed: options 0x%x are not offered", url.c_str(), options);
+        return posixError(ZOR_HERE, Errno(EINVAL), "write of %s failed: options 0x%x are not offered", url.c_str(),
+                          options);
     const plist::Data bytes = TRY(serialisedFor(url, dictionary, bytesMax));
     const auto parent = fileManager.resolver().openParent(url);
-    const int status =
+    const Errno error =
         parent ? fs::replaceFileDurably(
                      fileManager.disk(), parent->directory.get(), parent->name, 0644, bytes,
-                     [&](int file) { return -fileManager.setClassAtCreation(file, classWithoutProtection); })
-               : -parent.error().number();
-    if (status < 0)
-        return posixError(ZOR_HERE, -status, "write of %s failed: %s", url.c_str(), errorText(-status));
+                     [&](int file) { return fileManager.setClassAtCreation(file, classWithoutProtection); })
+               : parent.error();
+    if (error)
+        return posixError(ZOR_HERE, error, "write of %s failed: %s", url.c_str(), error.text());
     return {};
 }
 
@@ -44,13 +46,13 @@ Result<plist::Dictionary> readDictionaryAtURL(const FileURL& url, std::size_t by
         parent ? fs::readOwnedFile(fileManager.disk(), parent->directory.get(), parent->name.c_str(), bytesMax)
                : parent.error();
     if (!bytes)
-        return posixError(ZOR_HERE, bytes.error(), "read of %s failed: %s", url.c_str(), errorText(bytes.error()));
+        return posixError(ZOR_HERE, bytes.error(), "read of %s failed: %s", url.c_str(), bytes.error().text());
     auto value = plist::readPropertyList(*bytes);
     if (!value)
-        return posixError(ZOR_HERE, EINVAL, "read of %s failed: %s", url.c_str(), value.error().text().c_str());
+        return posixError(ZOR_HERE, Errno(EINVAL), "read of %s failed: %s", url.c_str(), value.error().text().c_str());
     plist::Dictionary* dictionary = value->asMutableDictionary();
     if (!dictionary)
-        return posixError(ZOR_HERE, EINVAL, "read of %s failed: it is no dictionary", url.c_str());
+        return posixError(ZOR_HERE, Errno(EINVAL), "read of %s failed: it is no dictionary", url.c_str());
     return std::move(*dictionary);
 }
 

@@ -121,7 +121,7 @@ BulkDirectoryRead& DirectoryStack::reader() {
             slot.buffer = std::make_unique<BulkDirectoryRead::Buffer>();
         slot.reader.emplace(slot.directory.get(), *slot.buffer);
         if (levels_.back().resume != 0)
-            slot.reader->seek(levels_.back().resume);
+            (void)slot.reader->seek(levels_.back().resume);
     }
     return *slot.reader;
 }
@@ -131,7 +131,7 @@ void DirectoryStack::rewind() {
     ++level.pass;
     level.entries = 0;
     level.resume = 0;
-    reader().seek(0);
+    (void)reader().seek(0); // the reader keeps the error
 }
 
 } // namespace zor::fs

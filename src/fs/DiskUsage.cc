@@ -99,7 +99,7 @@ public:
     void noteChangeOf(int directory);
     [[nodiscard]] const Usage& usage() const { return usage_; }
     [[nodiscard]] std::uint64_t entries() const { return entries_; }
-    void sayUnopened(const std::string& path, int error);
+    void sayUnopened(const std::string& path, Errno error);
 
 private:
     void measureDirectory(const std::string& path);
@@ -113,7 +113,7 @@ private:
     void measureDepthFirst(int parent, const std::string& path, const char* name);
     void addWalkEntry(const WalkEntry& entry, const std::string& top);
 
-    void sayUnexamined(const std::string& path, std::uint64_t index, int error);
+    void sayUnexamined(const std::string& path, std::uint64_t index, Errno error);
     void sayEmpty(const std::string& path) const;
     [[nodiscard]] bool logs(int level) const { return log_.write && level <= log_.levelMax; }
     [[nodiscard]] std::string fullPath(const std::string& path) const {
@@ -159,7 +159,7 @@ void Measurement::measureDirectory(const std::string& path) {
     if (!directory) {
         // A mount point is not part of the tree.
         if (directory.error() != EXDEV)
-            sayUnopened(path, directory.error().number());
+            sayUnopened(path, directory.error());
         return;
     }
     if (isInTree(directory->get()))
@@ -179,7 +179,7 @@ void Measurement::measureEntries(int directory, const std::string& path) {
         struct stat status{};
         if (entry->type == DT_DIR && !traits_.emptyDirectoryBytes) {
             addDirectory(directory, path, entry->name);
-        } else if (const int error = statusOfName(directory, entry->name, status); error != 0 && error != EXDEV) {
+        } else if (const Errno error = statusOfName(directory, entry->name, status); error && error != EXDEV) {
             sayUnexamined(path, index, error);
         } else if (error == EXDEV || status.st_dev != device_) {
             continue;
@@ -193,12 +193,12 @@ void Measurement::measureEntries(int directory, const std::string& path) {
     }
     entries_ += index;
     usage_.cutShort |= isOwnShortage(entries.error());
-    if (entries.error() != 0 && logs(logLevelError))
+    if (entries.error() && logs(logLevelError))
         tree_.write(logLevelError,
                     formatted("scanbatch on entry %llu in %s returned error %s", static_cast<unsigned long long>(index),
-                              ZOR_SHOWN(fullPath(path)), errorText(entries.error())));
+                              ZOR_SHOWN(fullPath(path)), entries.error().text()));
     // The end, where only the reading tells that there is nothing.
-    if (index == 0 && entries.error() == 0 && !path.empty())
+    if (index == 0 && !entries.error() && !path.empty())
         sayEmpty(path);
 }
 
@@ -221,18 +221,18 @@ void Measurement::measureDepthFirst(int parent, const std::string& path, const c
     const auto directory = platform::openBeneathOnMount(parent, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!directory) {
         if (directory.error() != EXDEV)
-            sayUnopened(top, directory.error().number());
+            sayUnopened(top, directory.error());
         return;
     }
     if (!isInTree(directory->get()))
         return;
     TreeWalker walker(WalkStatus::full);
-    const int result = walker.walk(directory->get(), ".", [&](const WalkEntry& entry) {
+    const Errno result = walker.walk(directory->get(), ".", [&](const WalkEntry& entry) {
         addWalkEntry(entry, top);
         return WalkStep::proceed;
     });
-    if (result < 0)
-        sayUnopened(top, -result);
+    if (result)
+        sayUnopened(top, result);
 }
 
 void Measurement::addWalkEntry(const WalkEntry& entry, const std::string& top) {
@@ -258,17 +258,17 @@ void Measurement::addWalkEntry(const WalkEntry& entry, const std::string& top) {
     }
 }
 
-void Measurement::sayUnopened(const std::string& path, int error) {
+void Measurement::sayUnopened(const std::string& path, Errno error) {
     usage_.cutShort |= isOwnShortage(error);
     if (logs(logLevelError))
         tree_.write(logLevelError,
-                    formatted("Failed to open directory %s : %s", ZOR_SHOWN(fullPath(path)), errorText(error)));
+                    formatted("Failed to open directory %s : %s", ZOR_SHOWN(fullPath(path)), error.text()));
 }
 
-void Measurement::sayUnexamined(const std::string& path, std::uint64_t index, int error) {
+void Measurement::sayUnexamined(const std::string& path, std::uint64_t index, Errno error) {
     usage_.cutShort |= isOwnShortage(error);
     if (logs(logLevelError))
-        tree_.write(logLevelError, formatted("Got error %s while processing entry %llu in %s", errorText(error),
+        tree_.write(logLevelError, formatted("Got error %s while processing entry %llu in %s", error.text(),
                                              static_cast<unsigned long long>(index), ZOR_SHOWN(fullPath(path))));
 }
 
@@ -283,7 +283,7 @@ Usage diskUsage(int directory, const std::string& path, const UsageLog& log) {
     Tree tree(directory, path, log);
     struct stat status{};
     const bool readable = ::fstat(directory, &status) == 0 && ::lseek(directory, 0, SEEK_SET) >= 0;
-    const int unreadable = readable ? 0 : errno;
+    const Errno unreadable = readable ? Errno() : Errno::last();
     tree.device = status.st_dev;
     Measurement own(tree);
     if (!readable) {

@@ -1,6 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/Durability.h"
 
+#include "base/Try.h"
+
 #include <cstdio>
 #include <string>
 #include <string_view>
@@ -76,12 +78,12 @@ Ordering Durability::ordering(int fd) const {
     return orderings_.emplace(status.st_dev, probe_(fd)).first->second;
 }
 
-int Durability::beforeMove(int file) const {
+Errno Durability::beforeMove(int file) const {
     return ordering(file) == Ordering::journal ? disk_.orderData(file) : disk_.syncFileSystem(file);
 }
 
-int Durability::beforeRemoval(int directory) const {
-    return ordering(directory) == Ordering::journal ? 0 : disk_.syncFileSystem(directory);
+Errno Durability::beforeRemoval(int directory) const {
+    return ordering(directory) == Ordering::journal ? Errno() : disk_.syncFileSystem(directory);
 }
 
 bool Durability::keepsOrder(int changed, int next) const {
@@ -89,17 +91,18 @@ bool Durability::keepsOrder(int changed, int next) const {
     return onOneFileSystem(changed, next) && ordering(changed) == Ordering::journal;
 }
 
-int Durability::between(int changed, int next) const {
-    return keepsOrder(changed, next) ? 0 : afterMove(changed);
+Errno Durability::between(int changed, int next) const {
+    return keepsOrder(changed, next) ? Errno() : afterMove(changed);
 }
 
-int Durability::afterMove(int directory) const {
+Errno Durability::afterMove(int directory) const {
     return ordering(directory) == Ordering::journal ? disk_.sync(directory) : disk_.syncFileSystem(directory);
 }
 
-int Durability::afterMoves(int directory, int other) const {
-    const int synced = onOneFileSystem(directory, other) ? 0 : afterMove(other);
-    return synced < 0 ? synced : afterMove(directory);
+Errno Durability::afterMoves(int directory, int other) const {
+    if (!onOneFileSystem(directory, other))
+        TRY(afterMove(other));
+    return afterMove(directory);
 }
 
 } // namespace zor::fs

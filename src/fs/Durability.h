@@ -16,6 +16,7 @@
 
 #include "base/Mutex.h"
 #include "platform/Disk.h"
+#include "platform/Errno.h"
 
 #include <map>
 #include <sys/types.h>
@@ -34,20 +35,19 @@ public:
     explicit Durability(platform::Disk& disk, Probe probe = orderingOfFileSystem) : disk_(disk), probe_(probe) {}
 
     /// Before a tree of new directories and small new files is moved into view. `file` is a new file in the tree whose
-    /// data counts. 0 or a negative errno.
-    [[nodiscard]] int beforeMove(int file) const;
+    /// data counts.
+    Errno beforeMove(int file) const;
     /// After things were moved to a directory to be removed there, before they are: else a cut could leave the removal
-    /// and undo the move. 0 or a negative errno.
-    [[nodiscard]] int beforeRemoval(int directory) const;
-    /// Between a change of names in one directory and one in another that must not be durable without it. 0 or a
-    /// negative errno.
-    [[nodiscard]] int between(int changed, int next) const;
+    /// and undo the move.
+    Errno beforeRemoval(int directory) const;
+    /// Between a change of names in one directory and one in another that must not be durable without it.
+    Errno between(int changed, int next) const;
     /// Whether the file systems see to that themselves, so that `between` has nothing to wait for.
     [[nodiscard]] bool keepsOrder(int changed, int next) const;
     /// After the move, before it is acknowledged; needs no lock. `directory` is where the name came to be.
-    [[nodiscard]] int afterMove(int directory) const;
+    Errno afterMove(int directory) const;
     /// The same for changes of names in two directories, which may lie on two file systems.
-    [[nodiscard]] int afterMoves(int directory, int other) const;
+    Errno afterMoves(int directory, int other) const;
 
 private:
     [[nodiscard]] Ordering ordering(int fd) const;

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/FileSystemDeathRow.h"
 
+#include "base/Try.h"
 #include "fs/Names.h"
 #include "os/Openat2.h"
 
@@ -29,53 +30,42 @@ OpenResult openClosed(int parent, const char* name) {
     return opened;
 }
 
-int makeIfMissing(platform::Disk& disk, int parent, const char* name) {
-    const int made = disk.makeDirectory(parent, name, closedMode);
-    return made == -EEXIST ? 0 : -made;
+Errno makeIfMissing(platform::Disk& disk, int parent, const char* name) {
+    const Errno made = disk.makeDirectory(parent, name, closedMode);
+    return made == EEXIST ? Errno() : made;
 }
 
 OpenResult openInner(int top, const char* inner) {
-    const OpenResult outer = openClosed(top, deathRowOuter);
-    return outer ? openClosed(outer->get(), inner) : OpenResult(outer.error());
+    return openClosed(TRY(openClosed(top, deathRowOuter)).get(), inner);
 }
 
 OpenResult openOrMakeInner(platform::Disk& disk, int top, const char* inner) {
-    if (const int failed = makeIfMissing(disk, top, deathRowOuter))
-        return Errno(failed);
-    const OpenResult outer = openClosed(top, deathRowOuter);
-    if (!outer)
-        return outer.error();
-    if (const int failed = makeIfMissing(disk, outer->get(), inner))
-        return Errno(failed);
-    return openClosed(outer->get(), inner);
+    TRY(makeIfMissing(disk, top, deathRowOuter));
+    const FileDescriptor outer = TRY(openClosed(top, deathRowOuter));
+    TRY(makeIfMissing(disk, outer.get(), inner));
+    return openClosed(outer.get(), inner);
 }
 
 } // namespace
 
 ErrnoOr<MountTop> topOfMount(const PathResolver& resolver, const FileURL& url) {
-    auto directory = resolver.openDirectoryPath(url);
-    if (!directory)
-        return directory.error();
-    const auto mount = platform::mountIdOf(directory->get());
-    if (!mount)
-        return mount.error();
+    FileDescriptor directory = TRY(resolver.openDirectoryPath(url));
+    const std::uint64_t mount = TRY(platform::mountIdOf(directory.get()));
     FileURL top = url;
     while (top.path() != resolver.root().canonicalPath() && top.path() != "/") {
         const FileURL above = top.deletingLastPathComponent();
-        auto opened = resolver.openDirectoryPath(above);
-        if (!opened)
-            return opened.error();
-        const auto mountAbove = platform::mountIdOf(opened->get());
-        if (!mountAbove || *mountAbove != *mount)
+        FileDescriptor opened = TRY(resolver.openDirectoryPath(above));
+        const auto mountAbove = platform::mountIdOf(opened.get());
+        if (!mountAbove || *mountAbove != mount)
             break;
         top = above;
         directory = std::move(opened);
     }
     struct stat status{};
-    if (::fstat(directory->get(), &status) != 0)
+    if (::fstat(directory.get(), &status) != 0)
         return Errno::last();
     return MountTop{
-        .url = std::move(top), .directory = std::move(*directory), .identity = {status.st_dev, status.st_ino}};
+        .url = std::move(top), .directory = std::move(directory), .identity = {status.st_dev, status.st_ino}};
 }
 
 FileURL deathRowBelow(const FileURL& top) {
@@ -107,8 +97,7 @@ OpenResult openAsideOf(const PathResolver& resolver, const FileURL& item) {
     const FileURL top = aside.deletingLastPathComponent().deletingLastPathComponent();
     if (asideBelow(top) != aside)
         return Errno(EINVAL);
-    const auto opened = resolver.openDirectoryPath(top);
-    return opened ? openAside(opened->get()) : OpenResult(opened.error());
+    return openAside(TRY(resolver.openDirectoryPath(top)).get());
 }
 
 void removeEmptyDeathRow(platform::Disk& disk, int top) {
@@ -117,8 +106,8 @@ void removeEmptyDeathRow(platform::Disk& disk, int top) {
         return;
     bool empty = true;
     for (const char* inner : {deathRowInner, asideInner}) {
-        const int removed = disk.removeDirectory(outer->get(), inner);
-        empty = empty && (removed == 0 || removed == -ENOENT);
+        const Errno removed = disk.removeDirectory(outer->get(), inner);
+        empty = empty && (!removed || removed == ENOENT);
     }
     if (empty)
         (void)disk.removeDirectory(top, deathRowOuter);

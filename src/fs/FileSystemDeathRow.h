@@ -12,7 +12,7 @@
 // may come back: a container that is being replaced, and what was copied here to take its place. A launch clears it.
 //
 // A stop leaves one directory or both, empty, or with items; the next pass finds them by their place. "The daemon's" is
-// the effective user's. All functions return a descriptor, 0, or an errno. Any thread.
+// the effective user's. Any thread.
 #pragma once
 
 #include "fs/PathResolver.h"

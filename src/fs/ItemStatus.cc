@@ -43,24 +43,24 @@ struct stat statusIn(const struct statx& found) {
 
 } // namespace
 
-int statusOfName(int directory, const char* name, struct stat& status) {
+Errno statusOfName(int directory, const char* name, struct stat& status) {
     struct statx found{};
     if (::statx(directory, name, remembered, STATX_BASIC_STATS, &found) != 0)
-        return errno;
+        return Errno::last();
     status = statusIn(found);
     // A directory that is open may be the root of a mount itself: "." leads nowhere else.
     const bool crossed = (found.stx_attributes & STATX_ATTR_MOUNT_ROOT) != 0 && std::strcmp(name, ".") != 0;
-    return crossed ? EXDEV : 0;
+    return crossed ? Errno(EXDEV) : Errno();
 }
 
-int statusOfDescriptor(int descriptor, struct stat& status, MountIdentity& mount) {
+Errno statusOfDescriptor(int descriptor, struct stat& status, MountIdentity& mount) {
     struct statx found{};
     if (::statx(descriptor, "", AT_EMPTY_PATH | remembered, STATX_BASIC_STATS | STATX_MNT_ID | uniqueMountWanted,
                 &found) != 0)
-        return errno;
+        return Errno::last();
     status = statusIn(found);
     mount = {.mount = found.stx_mnt_id, .device = status.st_dev};
-    return 0;
+    return Errno();
 }
 
 std::uint64_t mountNumber(int descriptor) {
@@ -76,7 +76,7 @@ bool isFreshDirectory(int directory) {
         return false;
     std::array<std::byte, 1024> buffer;
     BulkDirectoryRead entries(directory, buffer);
-    return entries.seek(0) == 0 && entries.next() == nullptr && entries.error() == 0;
+    return !entries.seek(0) && entries.next() == nullptr && !entries.error();
 }
 
 } // namespace zor::fs

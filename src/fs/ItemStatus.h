@@ -3,14 +3,16 @@
 // is not asked, and so cannot make anybody wait. Any thread.
 #pragma once
 
+#include "platform/Errno.h"
+
 #include <cstdint>
 #include <sys/stat.h>
 
 namespace zor::fs {
 
-/// lstat of one name in an open directory: 0 or an errno. EXDEV where another file system, or another part of this one,
+/// lstat of one name in an open directory. EXDEV where another file system, or another part of this one,
 /// is mounted on the name; `status` is then that of its root, as far as it is remembered (the type is).
-[[nodiscard]] int statusOfName(int directory, const char* name, struct stat& status);
+Errno statusOfName(int directory, const char* name, struct stat& status);
 
 /// Which mount something lies on. Kernels before 6.8 give the number of a mount that is gone to another one, seldom
 /// together with the number of its device.
@@ -19,8 +21,8 @@ struct MountIdentity {
     dev_t device = 0;
     bool operator==(const MountIdentity&) const = default;
 };
-/// fstat of an open descriptor (O_PATH too), and its mount: 0 or an errno.
-[[nodiscard]] int statusOfDescriptor(int descriptor, struct stat& status, MountIdentity& mount);
+/// fstat of an open descriptor (O_PATH too), and its mount.
+Errno statusOfDescriptor(int descriptor, struct stat& status, MountIdentity& mount);
 /// The number of the mount in /proc/self/mountinfo; 0 when it cannot be had.
 [[nodiscard]] std::uint64_t mountNumber(int descriptor);
 

@@ -98,7 +98,7 @@ std::size_t MountFence::ownBytes(std::string_view path) const {
 MountKind MountFence::Judgement::judge(int home) {
     struct stat status{};
     MountIdentity found;
-    if (statusOfDescriptor(home, status, found) != 0)
+    if (statusOfDescriptor(home, status, found))
         return MountKind::mayHang;
     {
         const MutexLock held(mutex);
@@ -177,30 +177,30 @@ OpenResult MountFence::open(const char* path, int flags) {
     return openBeneathOnMount(fence->get(), *rest == '\0' ? "." : rest, flags);
 }
 
-int MountFence::rememberedStatus(const char* path, struct stat& status) {
+bool MountFence::rememberedStatus(const char* path, struct stat& status) {
     {
         const MutexLock held(judgement_->mutex);
         if (judgement_->kind != MountKind::local)
-            return EAGAIN;
+            return false;
     }
     const auto item = platform::openBeneathRemembered(judgement_->root, path, O_NOFOLLOW);
     MountIdentity mount;
-    if (!item || statusOfDescriptor(item->get(), status, mount) != 0)
-        return EAGAIN;
+    if (!item || statusOfDescriptor(item->get(), status, mount))
+        return false;
     const MutexLock held(judgement_->mutex);
-    return judgement_->kind == MountKind::local && judgement_->mount == mount ? 0 : EAGAIN;
+    return judgement_->kind == MountKind::local && judgement_->mount == mount;
 }
 
-int MountFence::status(const char* path, struct stat& status) {
+Errno MountFence::status(const char* path, struct stat& status) {
     // A name that the kernel remembers on the judged mount is found without a question to any file system.
-    if (rememberedStatus(path, status) == 0)
-        return 0;
+    if (rememberedStatus(path, status))
+        return Errno();
     const std::size_t own = ownBytes(path);
     const bool isOwn = *behindSlashes(path + own) == '\0';
     if (isOwn && kind_ == Kind::home) {
         const auto fence = openOwn(path, own);
         MountIdentity mount;
-        return fence ? statusOfDescriptor(fence->get(), status, mount) : fence.error().number();
+        return fence ? statusOfDescriptor(fence->get(), status, mount) : fence.error();
     }
     const std::string whole(path);
     const std::size_t slash = whole.rfind('/');
@@ -209,14 +209,14 @@ int MountFence::status(const char* path, struct stat& status) {
     const auto directory =
         isOwn ? openBeneath(judgement_->root, parent.c_str(), pathFlags) : open(parent.c_str(), pathFlags);
     if (!directory)
-        return directory.error().number();
-    const int error = statusOfName(directory->get(), name.c_str(), status);
+        return directory.error();
+    const Errno error = statusOfName(directory->get(), name.c_str(), status);
     if (isOwn)
-        return error == EXDEV ? 0 : error;
+        return error == EXDEV ? Errno() : error;
     if (kind_ == Kind::systemPlace) {
         struct stat ignored{};
         MountIdentity mount;
-        if (statusOfDescriptor(directory->get(), ignored, mount) == 0) {
+        if (!statusOfDescriptor(directory->get(), ignored, mount)) {
             const MutexLock held(judgement_->mutex);
             judgement_->mount = mount;
             judgement_->kind = MountKind::local;

@@ -67,8 +67,8 @@ public:
     [[nodiscard]] bool answers(Asked asked = Asked::lately);
     /// Opens what lies at a path that the fence holds. EXDEV where that is, or lies behind, a mount point; EHOSTDOWN.
     [[nodiscard]] OpenResult open(const char* path, int flags);
-    /// lstat: 0 or an errno, as above.
-    [[nodiscard]] int status(const char* path, struct stat& status);
+    /// lstat, with the errors above.
+    Errno status(const char* path, struct stat& status);
 
 private:
     struct Answered {};
@@ -87,7 +87,8 @@ private:
         Answered ask() ZOR_EXCLUDES(mutex);
     };
     [[nodiscard]] OpenResult openOwn(const char* path, std::size_t ownBytes);
-    [[nodiscard]] int rememberedStatus(const char* path, struct stat& status);
+    /// False where a file system would have to be asked.
+    [[nodiscard]] bool rememberedStatus(const char* path, struct stat& status);
 
     const Kind kind_;
     const std::shared_ptr<Judgement> judgement_;

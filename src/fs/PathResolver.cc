@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/PathResolver.h"
 
+#include "base/Try.h"
 #include "os/Openat2.h"
 
 #include <algorithm>
@@ -46,11 +47,11 @@ bool PathResolver::answers(const FileURL& url, MountFence::Asked asked) const {
     MountFence* const fence = path ? fences_.around(path) : nullptr;
     const bool answered = !fence || fence->answers(asked);
     if (!answered)
-        noteLeft(url, EHOSTDOWN);
+        noteLeft(url, Errno(EHOSTDOWN));
     return answered;
 }
 
-void PathResolver::noteLeft(const FileURL& url, int error) const {
+void PathResolver::noteLeft(const FileURL& url, Errno error) const {
     if (left_ && (error == EXDEV || error == EHOSTDOWN))
         left_(url, error);
 }
@@ -64,7 +65,7 @@ OpenResult PathResolver::openItem(const FileURL& url, int flags) const {
         return openBeneath(root_.descriptor(), path, flags | O_NOFOLLOW);
     OpenResult opened = fence->open(path, flags | O_NOFOLLOW);
     if (!opened)
-        noteLeft(url, opened.error().number());
+        noteLeft(url, opened.error());
     return opened;
 }
 
@@ -77,25 +78,21 @@ OpenResult PathResolver::openDirectoryPath(const FileURL& url) const {
 }
 
 ErrnoOr<ParentAndName> PathResolver::openParent(const FileURL& url) const {
-    OpenResult directory = openDirectoryPath(url.deletingLastPathComponent());
-    if (!directory)
-        return directory.error();
-    return ParentAndName{std::move(*directory), std::string(url.lastPathComponent())};
+    return ParentAndName{TRY(openDirectoryPath(url.deletingLastPathComponent())), std::string(url.lastPathComponent())};
 }
 
-int PathResolver::status(const FileURL& url, struct stat& status) const {
+Errno PathResolver::status(const FileURL& url, struct stat& status) const {
     const char* path = relative(url);
     if (!path)
-        return EXDEV;
+        return Errno(EXDEV);
     if (MountFence* const fence = fences_.around(path)) {
-        const int error = fence->status(path, status);
+        const Errno error = fence->status(path, status);
         noteLeft(url, error);
         return error;
     }
-    const auto parent = openParent(url);
-    if (!parent)
-        return parent.error().number();
-    return ::fstatat(parent->directory.get(), parent->name.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0 ? 0 : errno;
+    const ParentAndName parent = TRY(openParent(url));
+    const int found = ::fstatat(parent.directory.get(), parent.name.c_str(), &status, AT_SYMLINK_NOFOLLOW);
+    return found == 0 ? Errno() : Errno::last();
 }
 
 ErrnoOr<PathResolver::Way> PathResolver::wayTo(const FileURL& url) const {
@@ -109,7 +106,7 @@ ErrnoOr<PathResolver::Way> PathResolver::wayTo(const FileURL& url) const {
         return Way{.fence = {}, .base = root_.descriptor(), .path = path, .mounts = Mounts::crossed};
     OpenResult base = fence->open(std::string(whole.substr(0, own)).c_str(), O_PATH | O_DIRECTORY);
     if (!base) {
-        noteLeft(url, base.error().number());
+        noteLeft(url, base.error());
         return base.error();
     }
     const int descriptor = base->get();
@@ -140,9 +137,9 @@ OpenResult makeDirectories(platform::Disk& disk, int base, std::string_view rela
             continue;
         OpenResult below = openBelow(current->get(), component.c_str(), flags, mounts);
         if (!below && below.error() == ENOENT) {
-            const int made = disk.makeDirectory(current->get(), component.c_str(), mode);
-            if (made < 0 && made != -EEXIST)
-                return Errno(-made);
+            const Errno made = disk.makeDirectory(current->get(), component.c_str(), mode);
+            if (made && made != EEXIST)
+                return made;
             below = openBelow(current->get(), component.c_str(), flags, mounts);
         }
         current = std::move(below);

@@ -4,8 +4,7 @@
 // Below a user's home every name can change between two system calls. So a path is resolved once, from the open root,
 // in one openat2 that follows no link and leaves no root; what comes after acts on the descriptor. A path outside the
 // root, a link on the way, or a "..", is an error, never a detour. Below a fence (fs/MountFences.h) a mount point on
-// the way is one too: EXDEV, and EHOSTDOWN where the file system of a home does not answer. All functions return a
-// descriptor or an errno. Any thread.
+// the way is one too: EXDEV, and EHOSTDOWN where the file system of a home does not answer. Any thread.
 #pragma once
 
 #include "base/FileURL.h"
@@ -42,13 +41,13 @@ struct DirectoryId {
     std::uint64_t mount = 0;
     bool operator==(const DirectoryId&) const = default;
 };
-/// Asks no server that keeps the file system. An errno.
+/// Asks no server that keeps the file system.
 [[nodiscard]] ErrnoOr<DirectoryId> directoryIdOf(int directory);
 
 class PathResolver {
 public:
     /// Told a path that was not entered, and why. Any thread; may throw nothing.
-    using Left = std::function<void(const FileURL& url, int error)>;
+    using Left = std::function<void(const FileURL& url, Errno error)>;
     explicit PathResolver(const platform::SystemRoot& root, Left left = nullptr)
         : root_(root), fences_(root.descriptor()), left_(std::move(left)) {}
     PathResolver(const PathResolver&) = delete;
@@ -66,8 +65,8 @@ public:
     /// With any flags; a link in the last place fails with ELOOP.
     [[nodiscard]] OpenResult openItem(const FileURL& url, int flags) const;
     [[nodiscard]] ErrnoOr<ParentAndName> openParent(const FileURL& url) const;
-    /// lstat: 0 or an errno.
-    [[nodiscard]] int status(const FileURL& url, struct stat& status) const;
+    /// lstat.
+    Errno status(const FileURL& url, struct stat& status) const;
     /// The beginning of a path for a caller that makes its missing parts: at its fence, which has to be there, or at
     /// the root.
     struct Way {
@@ -83,7 +82,7 @@ public:
     [[nodiscard]] const platform::SystemRoot& root() const { return root_; }
 
 private:
-    void noteLeft(const FileURL& url, int error) const;
+    void noteLeft(const FileURL& url, Errno error) const;
 
     const platform::SystemRoot& root_;
     mutable MountFences fences_; // knows no more of the disk than before

@@ -25,6 +25,7 @@
 
 #include "fs/TreeWalker.h"
 #include "platform/Disk.h"
+#include "platform/Errno.h"
 
 #include <cstdint>
 #include <functional>
@@ -32,29 +33,29 @@
 
 namespace zor::fs {
 
-/// 0, or -errno. -EEXIST when the destination exists, -ENOENT when the source does not. `goOn` is asked often; with the
-/// answer false the copy ends with -ECANCELED.
-int copyTree(platform::Disk& disk, int fromDirectory, const char* from, int toDirectory, const char* to,
-             const std::function<bool()>& goOn = {});
+/// EEXIST when the destination exists, ENOENT when the source does not. `goOn` is asked often; with the answer false
+/// the copy ends with ECANCELED.
+Errno copyTree(platform::Disk& disk, int fromDirectory, const char* from, int toDirectory, const char* to,
+               const std::function<bool()>& goOn = {});
 
 /// How the content of a directory is copied to become somebody's: whose, and what may come along.
 struct ContentRules {
     uid_t owner = 0;
     gid_t group = 0;
     /// Asked about each item before it is copied, with the status of what will be: `item` is the open file or
-    /// directory, -1 for all else and where none could be opened. Of a symbolic link with its target. Not 0, a -errno,
-    /// ends the copy.
-    std::function<int(const WalkEntry& entry, int item, const char* linkTarget)> admit;
+    /// directory, -1 for all else and where none could be opened. Of a symbolic link with its target. An error ends the
+    /// copy.
+    std::function<Errno(const WalkEntry& entry, int item, const char* linkTarget)> admit;
     /// Told of each piece of a file that was copied; the same.
-    std::function<int(std::uint64_t bytes)> copied;
+    std::function<Errno(std::uint64_t bytes)> copied;
     /// Told of the item at which the copy ended.
-    std::function<void(const WalkEntry& entry, int error)> failed;
+    std::function<void(const WalkEntry& entry, Errno error)> failed;
 };
 
 /// Copies everything below the open directory `from` into the open directory `to`, which is empty and closed to others,
 /// and stays so. As copyTree, but owner and group are those of the rules, no attributes and access control lists come
 /// along, of modes no more than the bits for access, and a directory's owner may always use it. All of `rules` is
-/// required. 0, or -errno.
-int copyContent(platform::Disk& disk, int from, int to, const ContentRules& rules);
+/// required.
+Errno copyContent(platform::Disk& disk, int from, int to, const ContentRules& rules);
 
 } // namespace zor::fs

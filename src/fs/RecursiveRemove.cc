@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/RecursiveRemove.h"
 
+#include "base/Try.h"
 #include "fs/ItemStatus.h"
 #include "fs/SharedWork.h"
 #include "fs/TreeWalker.h"
@@ -25,15 +26,15 @@ constexpr unsigned passesMax = 64;
 /// A second thread costs more than it brings for a tree of fewer entries.
 constexpr std::uint64_t entriesForTwoThreads = 512;
 
-/// 1 when one of `unwanted` was set and all of them are cleared, 0 when none was, or -errno.
-int clearInodeFlags(platform::Disk& disk, int fd, int unwanted) {
+/// Whether one of `unwanted` was set and all of them are cleared.
+ErrnoOr<bool> clearInodeFlags(platform::Disk& disk, int fd, int unwanted) {
     int flags = 0;
-    if (::ioctl(fd, FS_IOC_GETFLAGS, &flags) != 0)
-        return errno == ENOTTY || errno == EOPNOTSUPP || errno == ENOSYS ? 0 : -errno;
+    if (::ioctl(fd, FS_IOC_GETFLAGS, &flags) != 0 && errno != ENOTTY && errno != EOPNOTSUPP && errno != ENOSYS)
+        return Errno::last();
     if ((flags & unwanted) == 0)
-        return 0;
-    const int result = disk.setInodeFlags(fd, flags & ~unwanted);
-    return result < 0 ? result : 1;
+        return false;
+    TRY(disk.setInodeFlags(fd, flags & ~unwanted));
+    return true;
 }
 
 /// Takes the files out of the directories of a tree, on two threads at once. Whatever does not go at the first attempt
@@ -73,14 +74,14 @@ class Remover {
 public:
     Remover(platform::Disk& disk, const RemoveCallbacks& callbacks) : disk_(disk), callbacks_(callbacks) {}
 
-    int remove(int directory, const char* name);
+    Errno remove(int directory, const char* name);
 
 private:
     WalkStep visit(const WalkEntry& entry);
     WalkStep removeFile(const WalkEntry& entry);
     WalkStep removeDirectory(const WalkEntry& entry);
-    WalkStep changed(const WalkEntry& entry, int error);
-    WalkStep failed(const WalkEntry& entry, int error);
+    WalkStep changed(const WalkEntry& entry, Errno error);
+    WalkStep failed(const WalkEntry& entry, Errno error);
     bool makeParentMutable(const WalkEntry& entry);
     bool makeMutable(int directory, const std::string& path);
     [[nodiscard]] static bool stillNamed(const WalkEntry& entry);
@@ -90,33 +91,33 @@ private:
     int parent_ = -1;
     const char* name_ = nullptr;
     std::uint64_t entries_ = 0;
-    /// Why the root has to be looked at once more, or 0.
-    int rootChanged_ = 0;
+    /// Why the root has to be looked at once more.
+    Errno rootChanged_;
     /// The root is not what is to be removed.
     bool anotherMet_ = false;
     /// Directories of the current path up to this depth hold something that could not be removed; -1: none does.
     long doomedDepth_ = -1;
 };
 
-int Remover::remove(int directory, const char* name) {
+Errno Remover::remove(int directory, const char* name) {
     parent_ = directory;
     name_ = name;
     TreeWalker walker(WalkStatus::typeOnly);
     const TreeWalker::Visitor visitor = [this](const WalkEntry& entry) { return visit(entry); };
     for (unsigned pass = 1;; ++pass) {
-        rootChanged_ = 0;
+        rootChanged_ = Errno();
         doomedDepth_ = -1;
-        const int result = walker.walk(directory, name, visitor);
+        const Errno result = walker.walk(directory, name, visitor);
         if (anotherMet_)
-            return -ESTALE;
-        if (result == -ENOENT && pass > 1)
-            return 0;
-        if (result < 0 || rootChanged_ == 0)
+            return Errno(ESTALE);
+        if (result == ENOENT && pass > 1)
+            return Errno();
+        if (result || !rootChanged_)
             return result;
         if (pass == passesMax) {
             const RemoveFailure failure{.error = rootChanged_, .parent = directory, .name = name};
             callbacks_.failed(failure);
-            return 0;
+            return Errno();
         }
     }
 }
@@ -145,43 +146,43 @@ WalkStep Remover::visit(const WalkEntry& entry) {
 }
 
 WalkStep Remover::removeFile(const WalkEntry& entry) {
-    int result = disk_.unlinkFile(entry.parent, entry.name);
-    if (result == -EPERM && makeParentMutable(entry))
+    Errno result = disk_.unlinkFile(entry.parent, entry.name);
+    if (result == EPERM && makeParentMutable(entry))
         result = disk_.unlinkFile(entry.parent, entry.name);
-    if (result == 0 || result == -ENOENT)
+    if (!result || result == ENOENT)
         return WalkStep::proceed;
-    return result == -EISDIR ? changed(entry, EISDIR) : failed(entry, -result);
+    return result == EISDIR ? changed(entry, result) : failed(entry, result);
 }
 
 WalkStep Remover::removeDirectory(const WalkEntry& entry) {
-    int result = disk_.removeDirectory(entry.parent, entry.name);
-    if (result == -EPERM && makeParentMutable(entry))
+    Errno result = disk_.removeDirectory(entry.parent, entry.name);
+    if (result == EPERM && makeParentMutable(entry))
         result = disk_.removeDirectory(entry.parent, entry.name);
-    if (result == -EPERM && entry.directory >= 0 && makeMutable(entry.directory, entry.path()))
+    if (result == EPERM && entry.directory >= 0 && makeMutable(entry.directory, entry.path()))
         result = disk_.removeDirectory(entry.parent, entry.name);
     const bool doomed = doomedDepth_ >= static_cast<long>(entry.depth);
     doomedDepth_ = std::min(doomedDepth_, static_cast<long>(entry.depth) - 1);
-    if (result == 0 || result == -ENOENT)
+    if (!result || result == ENOENT)
         return WalkStep::proceed;
-    if (result == -ENOTDIR)
-        return changed(entry, ENOTDIR);
-    if (result != -ENOTEMPTY && result != -EEXIST)
-        return failed(entry, -result);
+    if (result == ENOTDIR)
+        return changed(entry, result);
+    if (result != ENOTEMPTY && result != EEXIST)
+        return failed(entry, result);
     if (entry.directory >= 0 && !stillNamed(entry))
-        return changed(entry, ENOTEMPTY);
+        return changed(entry, Errno(ENOTEMPTY));
     if (entry.kind == WalkEntryKind::directoryEnd && entry.directory >= 0 && !doomed && entry.pass < passesMax)
         return WalkStep::again;
-    return failed(entry, entry.error != 0 ? entry.error : ENOTEMPTY);
+    return failed(entry, entry.error ? entry.error : Errno(ENOTEMPTY));
 }
 
 /// Something else took the name meanwhile. Its directory, not being empty, is read again and finds it.
-WalkStep Remover::changed(const WalkEntry& entry, int error) {
+WalkStep Remover::changed(const WalkEntry& entry, Errno error) {
     if (entry.depth == 0)
         rootChanged_ = error;
     return WalkStep::proceed;
 }
 
-WalkStep Remover::failed(const WalkEntry& entry, int error) {
+WalkStep Remover::failed(const WalkEntry& entry, Errno error) {
     callbacks_.failed({.path = entry.path(), .error = error, .parent = entry.parent, .name = entry.name});
     struct stat status{};
     const bool repaired = statusOfName(entry.parent, entry.name, status) == ENOENT;
@@ -200,7 +201,7 @@ bool Remover::makeParentMutable(const WalkEntry& entry) {
 }
 
 bool Remover::makeMutable(int directory, const std::string& path) {
-    if (clearInodeFlags(disk_, directory, FS_IMMUTABLE_FL | FS_APPEND_FL) != 1)
+    if (!clearInodeFlags(disk_, directory, FS_IMMUTABLE_FL | FS_APPEND_FL).value_or(false))
         return false;
     if (callbacks_.directoryMadeMutable)
         callbacks_.directoryMadeMutable(path);
@@ -210,43 +211,41 @@ bool Remover::makeMutable(int directory, const std::string& path) {
 bool Remover::stillNamed(const WalkEntry& entry) {
     struct stat named{};
     struct stat opened{};
-    return statusOfName(entry.parent, entry.name, named) == 0 && ::fstat(entry.directory, &opened) == 0 &&
+    return !statusOfName(entry.parent, entry.name, named) && ::fstat(entry.directory, &opened) == 0 &&
            named.st_dev == opened.st_dev && named.st_ino == opened.st_ino;
 }
 
 } // namespace
 
-int removeTree(platform::Disk& disk, int directory, const char* name, const RemoveCallbacks& callbacks) {
+Errno removeTree(platform::Disk& disk, int directory, const char* name, const RemoveCallbacks& callbacks) {
     return Remover(disk, callbacks).remove(directory, name);
 }
 
-int removeTree(platform::Disk& disk, int directory, const char* name, const std::function<bool()>& goOn) {
-    int firstError = 0;
+Errno removeTree(platform::Disk& disk, int directory, const char* name, const std::function<bool()>& goOn) {
+    Errno firstError;
     RemoveCallbacks callbacks;
     callbacks.goOn = goOn;
     callbacks.failed = [&](const RemoveFailure& failure) {
-        if (firstError == 0)
+        if (!firstError)
             firstError = failure.error;
     };
-    const int result = removeTree(disk, directory, name, callbacks);
-    return result < 0 ? result : -firstError;
+    TRY(removeTree(disk, directory, name, callbacks));
+    return firstError;
 }
 
-int clearImmutable(platform::Disk& disk, int directory, const char* name) {
+ErrnoOr<bool> clearImmutable(platform::Disk& disk, int directory, const char* name) {
     // Only files and directories have inode flags; the same request to a device's driver could mean anything.
     struct stat status{};
-    if (const int error = statusOfName(directory, name, status))
-        return -error;
+    TRY(statusOfName(directory, name, status));
     if (!S_ISREG(status.st_mode) && !S_ISDIR(status.st_mode))
-        return 0;
-    const auto item = platform::openBeneathOnMount(directory, name, O_RDONLY | O_NONBLOCK | O_NOCTTY | O_NOFOLLOW);
-    if (!item)
-        return -item.error().number();
-    if (::fstat(item->get(), &status) != 0)
-        return -errno;
+        return false;
+    const platform::FileDescriptor item =
+        TRY(platform::openBeneathOnMount(directory, name, O_RDONLY | O_NONBLOCK | O_NOCTTY | O_NOFOLLOW));
+    if (::fstat(item.get(), &status) != 0)
+        return Errno::last();
     if (!S_ISREG(status.st_mode) && !S_ISDIR(status.st_mode))
-        return 0;
-    return clearInodeFlags(disk, item->get(), FS_IMMUTABLE_FL | FS_APPEND_FL);
+        return false;
+    return clearInodeFlags(disk, item.get(), FS_IMMUTABLE_FL | FS_APPEND_FL);
 }
 
 } // namespace zor::fs

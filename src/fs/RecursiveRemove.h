@@ -11,6 +11,7 @@
 #pragma once
 
 #include "platform/Disk.h"
+#include "platform/Errno.h"
 
 #include <functional>
 #include <string>
@@ -20,8 +21,8 @@ namespace zor::fs {
 struct RemoveFailure {
     /// Relative to the root of the removal; empty for the root itself. For messages.
     std::string path;
-    /// errno: why `name` of the open directory `parent` cannot be removed.
-    int error = 0;
+    /// Why `name` of the open directory `parent` cannot be removed.
+    Errno error;
     int parent = -1;
     const char* name = nullptr;
 };
@@ -34,22 +35,21 @@ struct RemoveCallbacks {
     /// way and was cleared. Optional.
     std::function<void(const std::string& path)> directoryMadeMutable;
     /// Asked with the root's open directory, before anything in it is touched; with the answer false nothing is, and
-    /// the removal ends with -ESTALE. Optional.
+    /// the removal ends with ESTALE. Optional.
     std::function<bool(int directory)> isMeant;
-    /// Asked before each item; with the answer false the removal ends with -ECANCELED. Optional.
+    /// Asked before each item; with the answer false the removal ends with ECANCELED. Optional.
     std::function<bool()> goOn;
 };
 
-/// 0 when everything was removed or told to `failed`; -ENOENT when there is no such item; another -errno when the root
-/// could not be examined.
-int removeTree(platform::Disk& disk, int directory, const char* name, const RemoveCallbacks& callbacks);
+/// No error when everything was removed or told to `failed`; ENOENT when there is no such item; another one when the
+/// root could not be examined.
+Errno removeTree(platform::Disk& disk, int directory, const char* name, const RemoveCallbacks& callbacks);
 
-/// Removes what can be removed. 0, or the first error that kept an item, as -errno; `goOn` as above.
-int removeTree(platform::Disk& disk, int directory, const char* name, const std::function<bool()>& goOn = {});
+/// Removes what can be removed. The first error that kept an item; `goOn` as above.
+Errno removeTree(platform::Disk& disk, int directory, const char* name, const std::function<bool()>& goOn = {});
 
-/// Clears the flags that keep an item from being removed, immutable and append-only, of a regular file or directory. 1
-/// when one was set and is cleared, 0 when none was (as on anything that cannot have them, links among them), or
-/// -errno.
-int clearImmutable(platform::Disk& disk, int directory, const char* name);
+/// Clears the flags that keep an item from being removed, immutable and append-only, of a regular file or directory.
+/// Whether one was set and is cleared: none is on anything that cannot have them, links among them.
+[[nodiscard]] ErrnoOr<bool> clearImmutable(platform::Disk& disk, int directory, const char* name);
 
 } // namespace zor::fs

@@ -35,12 +35,12 @@ std::string WalkEntry::path() const {
     return stack->path().empty() ? std::string(name) : stack->path() + '/' + name;
 }
 
-int TreeWalker::walk(int parent, const char* name, const Visitor& visitor) {
+Errno TreeWalker::walk(int parent, const char* name, const Visitor& visitor) {
     stack_.clear();
     visitor_ = &visitor;
     rootParent_ = parent;
     rootName_ = name;
-    rootError_ = 0;
+    rootError_ = Errno();
     vanishedDirectories_ = 0;
     WalkStep step = visitRoot();
     while (step != WalkStep::stop && !stack_.empty()) {
@@ -56,15 +56,15 @@ int TreeWalker::walk(int parent, const char* name, const Visitor& visitor) {
             step = finishDirectory();
     }
     stack_.clear();
-    return step == WalkStep::stop ? -ECANCELED : -rootError_;
+    return step == WalkStep::stop ? Errno(ECANCELED) : rootError_;
 }
 
 WalkStep TreeWalker::visitRoot() {
     WalkEntry entry{.parent = rootParent_, .name = rootName_.c_str(), .stack = &stack_};
-    const int error = statusOfName(rootParent_, entry.name, entry.status);
+    const Errno error = statusOfName(rootParent_, entry.name, entry.status);
     if (error == EXDEV)
         return visitMountPoint(entry);
-    if (error != 0) {
+    if (error) {
         rootError_ = error;
         return WalkStep::proceed;
     }
@@ -76,10 +76,10 @@ WalkStep TreeWalker::visitName(WalkEntry entry, unsigned char type) {
     for (int change = 0;; ++change) {
         if (type != DT_DIR) {
             if (type == DT_UNKNOWN || statusWanted_ == WalkStatus::full) {
-                const int error = statusOfName(entry.parent, entry.name, entry.status);
+                const Errno error = statusOfName(entry.parent, entry.name, entry.status);
                 if (error == EXDEV)
                     return visitMountPoint(entry);
-                if (error != 0) {
+                if (error) {
                     entry.error = error;
                     if (entry.depth == 0)
                         rootError_ = entry.error;
@@ -94,7 +94,7 @@ WalkStep TreeWalker::visitName(WalkEntry entry, unsigned char type) {
         auto directory = platform::openBeneathOnMount(entry.parent, entry.name, directoryFlags);
         if (directory)
             return visitDirectory(entry, std::move(*directory));
-        const int error = directory.error().number();
+        const Errno error = directory.error();
         if ((error != ENOTDIR && error != ELOOP && error != ENOENT) || change == changesMax)
             return visitUnopened(entry, error);
         if (error == ENOENT && entry.depth > 0)
@@ -111,7 +111,7 @@ WalkStep TreeWalker::visitNonDirectory(WalkEntry& entry) {
 
 WalkStep TreeWalker::visitDirectory(WalkEntry& entry, FileDescriptor directory) {
     if (::fstat(directory.get(), &entry.status) != 0)
-        return visitUnopened(entry, errno);
+        return visitUnopened(entry, Errno::last());
     if (atRoot())
         device_ = entry.status.st_dev;
     if (entry.status.st_dev != device_)
@@ -144,7 +144,7 @@ WalkStep TreeWalker::visitMountPoint(WalkEntry& entry) {
     return (*visitor_)(entry);
 }
 
-WalkStep TreeWalker::visitUnopened(WalkEntry& entry, int error) {
+WalkStep TreeWalker::visitUnopened(WalkEntry& entry, Errno error) {
     if (error == EXDEV)
         return visitMountPoint(entry);
     if (statusWanted_ == WalkStatus::full && statusOfName(entry.parent, entry.name, entry.status) == ENOENT)
@@ -175,8 +175,8 @@ WalkStep TreeWalker::finishDirectory() {
                     .stack = &stack_};
     entry.status.st_mode = S_IFDIR;
     if (statusWanted_ == WalkStatus::full && ::fstat(entry.directory, &entry.status) != 0)
-        entry.error = errno;
-    if (entry.error != 0)
+        entry.error = Errno::last();
+    if (entry.error)
         entry.kind = WalkEntryKind::unreadableDirectory;
     const WalkStep step = (*visitor_)(entry);
     if (step == WalkStep::again && entry.kind == WalkEntryKind::directoryEnd)

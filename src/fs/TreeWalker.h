@@ -16,6 +16,7 @@
 #pragma once
 
 #include "fs/DirectoryStack.h"
+#include "platform/Errno.h"
 
 #include <cstddef>
 #include <cstdint>
@@ -47,7 +48,7 @@ struct WalkEntry {
     /// The item's own, never that of a link's target. With WalkStatus::typeOnly, and on other file systems, only the
     /// type in st_mode and st_ino mean something.
     struct stat status{};
-    int error = 0;
+    Errno error;
     /// Lies on another file system than the root: leave it alone.
     bool onOtherFileSystem = false;
     /// 0 for the root.
@@ -79,9 +80,8 @@ public:
     explicit TreeWalker(WalkStatus status = WalkStatus::full) : statusWanted_(status) {}
 
     /// Walks from the entry `name` (one component, or "." for `parent` itself) of the open directory `parent`.
-    /// 0 at the end; -ECANCELED when the visitor stopped it; another -errno when the root could not be examined (no
-    /// visit).
-    int walk(int parent, const char* name, const Visitor& visitor);
+    /// ECANCELED when the visitor stopped it; another error when the root could not be examined (no visit).
+    Errno walk(int parent, const char* name, const Visitor& visitor);
 
     /// How many directories of the last walk were moved or replaced so that they could not be finished. Those had no
     /// end visit.
@@ -91,7 +91,7 @@ private:
     WalkStep visitRoot();
     WalkStep visitName(WalkEntry entry, unsigned char type);
     WalkStep visitDirectory(WalkEntry& entry, platform::FileDescriptor directory);
-    WalkStep visitUnopened(WalkEntry& entry, int error);
+    WalkStep visitUnopened(WalkEntry& entry, Errno error);
     WalkStep visitMountPoint(WalkEntry& entry);
     WalkStep visitNonDirectory(WalkEntry& entry);
     WalkStep finishDirectory();
@@ -103,7 +103,7 @@ private:
     std::string rootName_;
     dev_t device_ = 0;
     /// Why the root could not be examined.
-    int rootError_ = 0;
+    Errno rootError_;
     std::size_t vanishedDirectories_ = 0;
     DirectoryStack stack_;
 };

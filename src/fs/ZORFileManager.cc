@@ -26,16 +26,14 @@ constexpr std::size_t leftSaidMax = 200;
 constexpr mode_t closedMode = 0700;
 constexpr mode_t permissionBits = 07777;
 
-/// lstat: 0 or an errno.
-int statusBelow(int base, const std::string& relativePath, Mounts mounts, struct stat& status) {
+/// lstat.
+Errno statusBelow(int base, const std::string& relativePath, Mounts mounts, struct stat& status) {
     const std::size_t slash = relativePath.rfind('/');
     const std::string above = slash == relativePath.npos ? "." : relativePath.substr(0, slash);
-    const auto parent = fs::openBelow(base, above.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW, mounts);
-    if (!parent)
-        return parent.error().number();
+    const FileDescriptor parent = TRY(fs::openBelow(base, above.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW, mounts));
     const char* const name = relativePath.c_str() + (slash == relativePath.npos ? 0 : slash + 1);
-    const int error = fs::statusOfName(parent->get(), name, status);
-    return error == EXDEV && mounts == Mounts::crossed ? 0 : error;
+    const Errno error = fs::statusOfName(parent.get(), name, status);
+    return error == EXDEV && mounts == Mounts::crossed ? Errno() : error;
 }
 
 /// The call in messages.
@@ -45,7 +43,7 @@ const char* makingVerb(Intermediates intermediates) {
 
 } // namespace
 
-void ZORFileManager::sayLeft(const std::string& path, int error) {
+void ZORFileManager::sayLeft(const std::string& path, Errno error) {
     {
         const platform::MutexLock held(saidMutex_);
         if (saidLeft_.size() >= leftSaidMax || !saidLeft_.insert(path).second)
@@ -67,7 +65,7 @@ Result<FileDescriptor> ZORFileManager::openOrCreateDirectoryAtURL(const FileURL&
     const auto way = resolver_.wayTo(url);
     if (!way)
         return posixError(ZOR_HERE, way.error(), "Failed to determine if %s exists: %s", url.c_str(),
-                          errorText(way.error()));
+                          way.error().text());
     return openOrCreate({.directory = way->base, .mounts = way->mounts}, way->path, url, intermediates, attributes);
 }
 
@@ -91,14 +89,13 @@ Result<FileDescriptor> ZORFileManager::openOrCreate(const Base& base, const std:
         constexpr Here here{"createDirectoryAtURL", __LINE__};
         struct stat status{};
         const bool misshapen = existing.error() == ELOOP || existing.error() == ENOTDIR;
-        const int failure =
-            misshapen ? statusBelow(base.directory, relativePath, base.mounts, status) : existing.error().number();
-        if (failure != 0)
-            return posixError(here, failure, "Failed to determine if %s exists: %s", url.c_str(), errorText(failure));
+        const Errno failure =
+            misshapen ? statusBelow(base.directory, relativePath, base.mounts, status) : existing.error();
+        if (failure)
+            return posixError(here, failure, "Failed to determine if %s exists: %s", url.c_str(), failure.text());
         // It is there: a link, or a file.
-        const int number = S_ISLNK(status.st_mode) ? ELOOP : ENOTDIR;
-        return posixError(here, number, "%s of %s failed: %s", makingVerb(intermediates), url.c_str(),
-                          errorText(number));
+        const Errno number(S_ISLNK(status.st_mode) ? ELOOP : ENOTDIR);
+        return posixError(here, number, "%s of %s failed: %s", makingVerb(intermediates), url.c_str(), number.text());
     }
     TRY(mendDirectory(existing->get(), url, attributes));
     return std::move(*existing);
@@ -107,13 +104,14 @@ Result<FileDescriptor> ZORFileManager::openOrCreate(const Base& base, const std:
 Result<void> ZORFileManager::judgeOwner(int directory, const FileURL& url, std::uint32_t owner) const {
     struct stat status{};
     if (::fstat(directory, &status) != 0)
-        return posixError(ZOR_HERE, errno, "Failed to determine if %s exists: %s", url.c_str(), errorText(errno));
+        return posixError(ZOR_HERE, Errno::last(), "Failed to determine if %s exists: %s", url.c_str(),
+                          Errno::last().text());
     return judgeOwner(status, url, owner);
 }
 
 Result<void> ZORFileManager::judgeOwner(const struct stat& status, const FileURL& url, std::uint32_t owner) const {
     if (status.st_uid != ownerToBe(owner))
-        return posixError(ZOR_HERE, EPERM,
+        return posixError(ZOR_HERE, Errno(EPERM),
                           "%s belongs to user %u instead of user %u, so it stays as it is; move it away, and it is "
                           "made anew",
                           url.c_str(), status.st_uid, ownerToBe(owner));
@@ -123,7 +121,7 @@ Result<void> ZORFileManager::judgeOwner(const struct stat& status, const FileURL
 Result<FileDescriptor> ZORFileManager::openDirectoryOf(std::uint32_t owner, const FileURL& url) const {
     auto opened = resolver_.openDirectory(url);
     if (!opened)
-        return posixError(ZOR_HERE, opened.error(), "open of %s failed: %s", url.c_str(), errorText(opened.error()));
+        return posixError(ZOR_HERE, opened.error(), "open of %s failed: %s", url.c_str(), opened.error().text());
     TRY(judgeOwner(opened->get(), url, owner));
     return std::move(*opened);
 }
@@ -135,7 +133,8 @@ uid_t ZORFileManager::ownerToBe(std::uint32_t owner) const {
 Result<void> ZORFileManager::mendDirectory(int directory, const FileURL& url, const DirectoryAttributes& attributes) {
     struct stat status{};
     if (::fstat(directory, &status) != 0)
-        return posixError(ZOR_HERE, errno, "Failed to determine if %s exists: %s", url.c_str(), errorText(errno));
+        return posixError(ZOR_HERE, Errno::last(), "Failed to determine if %s exists: %s", url.c_str(),
+                          Errno::last().text());
     if (attributes.otherOwner != ownerUnchanged && status.st_uid == attributes.otherOwner)
         return {};
     TRY(judgeOwner(status, url, attributes.owner));
@@ -150,14 +149,14 @@ Result<void> ZORFileManager::mendDirectory(int directory, const FileURL& url, co
     // Whatever user can write the parent can have given its name to another directory of this owner's, one that is
     // closed for a reason. Only who may write the directory itself can move it to another parent meanwhile.
     if (::fstatat(directory, "..", &parent, 0) != 0)
-        return posixError(ZOR_HERE, errno, "opendir of %s failed: %s", url.c_str(), errorText(errno));
+        return posixError(ZOR_HERE, Errno::last(), "opendir of %s failed: %s", url.c_str(), Errno::last().text());
     const bool othersCanName = (parent.st_mode & (S_IWGRP | S_IWOTH)) != 0 ||
                                (parent.st_uid != status.st_uid && parent.st_uid != daemon_ && parent.st_uid != 0);
     if (!groupFits && !othersCanName)
-        disk_.changeOwner(directory, attributes.owner, attributes.owner);
+        (void)disk_.changeOwner(directory, attributes.owner, attributes.owner);
     const mode_t mended = othersCanName ? mode & attributes.mode : attributes.mode;
     if (mended != mode)
-        disk_.changeMode(directory, mended);
+        (void)disk_.changeMode(directory, mended);
     return {};
 }
 
@@ -174,36 +173,35 @@ Result<FileDescriptor> ZORFileManager::makeNewDirectory(const Base& base, std::s
     struct stat above{};
     if (parent && base.isUsers && ::fstat(parent->get(), &above) == 0 && above.st_uid != ownerToBe(attributes.owner) &&
         (above.st_uid != daemon_ || (above.st_mode & S_IXOTH) == 0))
-        return posixError(ZOR_HERE, EPERM, "%s belongs to user %u, so nothing is made in it; move it away",
+        return posixError(ZOR_HERE, Errno(EPERM), "%s belongs to user %u, so nothing is made in it; move it away",
                           parentUrl.c_str(), above.st_uid);
     const std::string finalName(url.lastPathComponent());
     std::string name;
-    int made = parent ? -EEXIST : -parent.error().number();
-    for (int tried = 0; parent && made == -EEXIST && tried < namesTriedMax; ++tried) {
+    Errno made = parent ? Errno(EEXIST) : parent.error();
+    for (int tried = 0; parent && made == EEXIST && tried < namesTriedMax; ++tried) {
         name = uniqueName(finalName + ".");
         made = disk_.makeDirectory(parent->get(), name.c_str(), closedMode);
     }
     const std::string temporaryPath = parent ? parentUrl.appendingDirectory(name).path() : url.path();
-    if (made == -EEXIST)
-        return posixError(ZOR_HERE, EEXIST, "Failed to create temp dir at path %s : %s", temporaryPath.c_str(),
-                          errorText(EEXIST));
-    if (made < 0)
-        return posixError(ZOR_HERE, -made, "%s of %s failed: %s", makingVerb(intermediates), temporaryPath.c_str(),
-                          errorText(-made));
+    if (made == EEXIST)
+        return posixError(ZOR_HERE, Errno(EEXIST), "Failed to create temp dir at path %s : %s", temporaryPath.c_str(),
+                          Errno(EEXIST).text());
+    if (made)
+        return posixError(ZOR_HERE, made, "%s of %s failed: %s", makingVerb(intermediates), temporaryPath.c_str(),
+                          made.text());
     auto directory = openBeneathOnMount(parent->get(), name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!directory)
         return posixError(ZOR_HERE, directory.error(), "opendir of %s failed: %s", temporaryPath.c_str(),
-                          errorText(directory.error()));
+                          directory.error().text());
     // A user who can write the parent can have put another directory there.
     if (!fs::isFreshDirectory(directory->get()))
-        return posixError(ZOR_HERE, EPERM, "%s was exchanged while it was made; it stays as it is",
+        return posixError(ZOR_HERE, Errno(EPERM), "%s was exchanged while it was made; it stays as it is",
                           temporaryPath.c_str());
     Result<void> placed = giveNewDirectory(directory->get(), temporaryPath, attributes);
     if (placed)
-        if (const int renamed = disk_.rename(parent->get(), name.c_str(), parent->get(), finalName.c_str(), 0);
-            renamed < 0)
-            placed = posixError(ZOR_HERE, -renamed, "failed to rename from %s to %s : %s", temporaryPath.c_str(),
-                                url.c_str(), errorText(-renamed));
+        if (const Errno renamed = disk_.rename(parent->get(), name.c_str(), parent->get(), finalName.c_str(), 0))
+            placed = posixError(ZOR_HERE, renamed, "failed to rename from %s to %s : %s", temporaryPath.c_str(),
+                                url.c_str(), renamed.text());
     if (!placed) {
         (void)disk_.removeDirectory(parent->get(), name.c_str());
         return std::move(placed).error();
@@ -217,102 +215,102 @@ Result<void> ZORFileManager::giveNewDirectory(int directory, const std::string& 
     if (protectionClass != protectionClassUnchanged)
         TRY(classSet(setClassOfNew(directory, protectionClass), path, protectionClass));
     // One that could not be given would be another's for ever once it had its name.
-    int status = disk_.changeMode(directory, attributes.mode);
+    Errno error = disk_.changeMode(directory, attributes.mode);
     const char* verb = "chmod";
-    if (status == 0 && attributes.owner != ownerUnchanged) {
-        status = disk_.changeOwner(directory, attributes.owner, attributes.owner);
+    if (!error && attributes.owner != ownerUnchanged) {
+        error = disk_.changeOwner(directory, attributes.owner, attributes.owner);
         verb = "chown";
     }
-    if (status < 0)
-        return posixError(ZOR_HERE, -status, "%s of %s failed: %s", verb, path.c_str(), errorText(-status));
+    if (error)
+        return posixError(ZOR_HERE, error, "%s of %s failed: %s", verb, path.c_str(), error.text());
     return {};
 }
 
-Result<void> ZORFileManager::classSet(int failure, const std::string& path, int protectionClass) {
-    if (failure != 0)
+Result<void> ZORFileManager::classSet(Errno failure, const std::string& path, int protectionClass) {
+    if (failure)
         return posixError(ZOR_HERE, failure, "Failed to setclass(%d) on directory %s: %s", protectionClass,
-                          path.c_str(), errorText(failure));
+                          path.c_str(), failure.text());
     return {};
 }
 
-int ZORFileManager::setClassAtCreation(int directory, int protectionClass) {
+Errno ZORFileManager::setClassAtCreation(int directory, int protectionClass) {
     const auto current = protection_.classOf(directory);
-    return current && *current == protectionClass ? 0 : setClass(directory, protectionClass);
+    return current && *current == protectionClass ? Errno() : setClass(directory, protectionClass);
 }
 
-int ZORFileManager::setClassOfNew(int fd, int protectionClass) {
-    return protectionClass == platform::defaultProtectionClass ? 0 : setClass(fd, protectionClass);
+Errno ZORFileManager::setClassOfNew(int fd, int protectionClass) {
+    return protectionClass == platform::defaultProtectionClass ? Errno() : setClass(fd, protectionClass);
 }
 
-int ZORFileManager::setClass(int fd, int protectionClass) {
-    const int failure = protection_.setClass(fd, protectionClass).number();
+Errno ZORFileManager::setClass(int fd, int protectionClass) {
+    const Errno failure = protection_.setClass(fd, protectionClass);
     if (failure != ENOTSUP)
         return failure;
     if (!saidClassesUnsupported_.exchange(true))
         log_.write(logLevelNotice, "setClassAtCreation",
                    "The file system keeps no extended attributes; new directories have no protection class");
-    return 0;
+    return Errno();
 }
 
 Result<FileURL> ZORFileManager::createTemporaryDirectoryInDirectoryURL(const FileURL& directory) {
     const auto parent = resolver_.openDirectoryPath(directory);
     std::string name;
-    int made = parent ? -EEXIST : -parent.error().number();
-    for (int tried = 0; parent && made == -EEXIST && tried < namesTriedMax; ++tried) {
+    Errno made = parent ? Errno(EEXIST) : parent.error();
+    for (int tried = 0; parent && made == EEXIST && tried < namesTriedMax; ++tried) {
         name = uniqueName("temp.");
         made = disk_.makeDirectory(parent->get(), name.c_str(), closedMode);
     }
     FileURL url = directory.appendingDirectory(name);
-    if (made < 0)
-        return posixError(ZOR_HERE, -made, "Failed to create temp dir at path %s : %s",
-                          directory.appendingDirectory("temp.XXXXXX").c_str(), errorText(-made));
+    if (made)
+        return posixError(ZOR_HERE, made, "Failed to create temp dir at path %s : %s",
+                          directory.appendingDirectory("temp.XXXXXX").c_str(), made.text());
     return url;
 }
 
 bool ZORFileManager::itemExistsAtURL(const FileURL& url) {
     struct stat status{};
-    const int failure = resolver_.status(url, status);
-    if (failure != 0 && failure != ENOENT)
-        log_.write(logLevelError, __func__, "Failed to determine if %s exists: %s", url.c_str(), errorText(failure));
-    return failure == 0;
+    const Errno failure = resolver_.status(url, status);
+    if (failure && failure != ENOENT)
+        log_.write(logLevelError, __func__, "Failed to determine if %s exists: %s", url.c_str(), failure.text());
+    return !failure;
 }
 
 bool ZORFileManager::itemDoesNotExistAtURL(const FileURL& url) {
     struct stat status{};
-    const int failure = resolver_.status(url, status);
+    const Errno failure = resolver_.status(url, status);
     const bool hidden = failure == ENOENT && fs::hiddenBy(resolver_, disk_, url);
-    if (failure != 0 && (failure != ENOENT || hidden))
+    if (failure && (failure != ENOENT || hidden))
         log_.write(logLevelError, __func__, "Failed to determine if %s exists: %s", url.c_str(),
-                   errorText(hidden ? ENOKEY : failure));
+                   (hidden ? Errno(ENOKEY) : failure).text());
     return failure == ENOENT && !hidden;
 }
 
 bool ZORFileManager::itemIsGone(const FileURL& url) const {
     struct stat status{};
-    const int failure = resolver_.status(url, status);
+    const Errno failure = resolver_.status(url, status);
     return failure == ENOTDIR || (failure == ENOENT && !fs::hiddenBy(resolver_, disk_, url));
 }
 
 bool ZORFileManager::itemDoesNotExistBelow(int directory, const char* relativePath, const FileURL& url) {
     const auto item = openBeneathOnMount(directory, relativePath, O_PATH | O_NOFOLLOW);
-    int failure = item ? 0 : item.error().number();
+    Errno failure = item ? Errno() : item.error();
     const std::string_view path = relativePath;
     if (failure == ENOENT &&
         fs::hidesNamesBelow(disk_, directory, path.contains('/') ? std::string(path, 0, path.rfind('/')).c_str() : "."))
-        failure = ENOKEY;
-    if (failure != 0 && failure != ENOENT)
-        log_.write(logLevelError, __func__, "Failed to determine if %s exists: %s", url.c_str(), errorText(failure));
+        failure = Errno(ENOKEY);
+    if (failure && failure != ENOENT)
+        log_.write(logLevelError, __func__, "Failed to determine if %s exists: %s", url.c_str(), failure.text());
     return failure == ENOENT;
 }
 
 Result<int> ZORFileManager::dataProtectionClassOfItemAtURL(const FileURL& url) {
     const auto item = resolver_.openItem(url, O_RDONLY | O_NONBLOCK | O_NOCTTY);
     if (!item)
-        return posixError(ZOR_HERE, item.error(), "Failed to open %s : %s", url.c_str(), errorText(item.error()));
+        return posixError(ZOR_HERE, item.error(), "Failed to open %s : %s", url.c_str(), item.error().text());
     const auto current = protection_.classOf(item->get());
     if (!current)
         return posixError(ZOR_HERE, current.error(), "Failed to getclass of file %s: %s", url.c_str(),
-                          errorText(current.error()));
+                          current.error().text());
     return *current;
 }
 
@@ -320,7 +318,7 @@ Result<void> ZORFileManager::setDataProtectionClassOfItemAtURL(const FileURL& ur
                                                                const std::function<bool(int)>& predicate) {
     const auto item = resolver_.openItem(url, O_RDONLY | O_NONBLOCK | O_NOCTTY);
     if (!item)
-        return posixError(ZOR_HERE, item.error(), "Failed to open %s : %s", url.c_str(), errorText(item.error()));
+        return posixError(ZOR_HERE, item.error(), "Failed to open %s : %s", url.c_str(), item.error().text());
     return setClassOf(item->get(), url.path(), protectionClass, predicate);
 }
 
@@ -341,7 +339,7 @@ Result<void> ZORFileManager::setDataProtectionClassOfEntry(
     struct stat status{};
     if (!item || ::fstat(item->get(), &status) != 0) {
         const Errno number = platform::neverLocked(item ? Errno::last() : item.error());
-        return posixError(ZOR_HERE, number, "Failed to open %s : %s", ZOR_SHOWN(path), errorText(number));
+        return posixError(ZOR_HERE, number, "Failed to open %s : %s", ZOR_SHOWN(path), number.text());
     }
     if (!S_ISREG(status.st_mode))
         return {};
@@ -355,13 +353,13 @@ Result<void> ZORFileManager::setClassOf(int fd, const std::string& path, int pro
         const auto current = protection_.classOf(fd);
         if (!current)
             return posixError(here, current.error(), "Failed to getclass of file %s: %s", ZOR_SHOWN(path),
-                              errorText(current.error()));
+                              current.error().text());
         if (!predicate(*current))
             return {};
     }
     if (const Errno failure = protection_.setClass(fd, protectionClass))
         return posixError(here, failure, "Failed to setclass(%d) on file %s: %s", protectionClass, ZOR_SHOWN(path),
-                          errorText(failure));
+                          failure.text());
     return {};
 }
 

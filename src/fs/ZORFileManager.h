@@ -19,6 +19,7 @@
 #include "fs/TreeWalker.h"
 #include "platform/Device.h"
 #include "platform/Disk.h"
+#include "platform/Errno.h"
 #include "plist/Value.h"
 
 #include <atomic>
@@ -57,8 +58,8 @@ public:
     ZORFileManager(const Log& log, const platform::SystemRoot& root, platform::Disk& disk,
                    platform::FileProtectionClass& protection)
         : log_(log), disk_(disk), protection_(protection),
-          resolver_(root, [this](const FileURL& url, int error) { sayLeft(url.path(), error); }), daemon_(::geteuid()) {
-    }
+          resolver_(root, [this](const FileURL& url, Errno error) { sayLeft(url.path(), error); }),
+          daemon_(::geteuid()) {}
     ZORFileManager(const ZORFileManager&) = delete;
     ZORFileManager& operator=(const ZORFileManager&) = delete;
 
@@ -163,13 +164,12 @@ public:
     /// See PathResolver::fence. Before the first use of what lies there.
     void fence(const FileURL& url, fs::MountFence::Kind kind) { resolver_.fence(url, kind); }
     /// Says, once for a path, that it was left alone: a mount point (EXDEV), or below a home that does not answer.
-    void sayLeft(const std::string& path, int error);
+    void sayLeft(const std::string& path, Errno error);
     [[nodiscard]] platform::Disk& disk() { return disk_; }
     /// Sets a class at the creation of a directory; a file system without classes is said once and is no failure.
-    /// 0 or an errno.
-    int setClassAtCreation(int directory, int protectionClass);
+    Errno setClassAtCreation(int directory, int protectionClass);
     /// The same for what this process has just made, which has no recorded class.
-    int setClassOfNew(int fd, int protectionClass);
+    Errno setClassOfNew(int fd, int protectionClass);
 
 private:
     enum class MissingSource { fails, isFine };
@@ -178,8 +178,8 @@ private:
                                 const GoOn& goOn);
     Result<void> moveAcrossFileSystems(int fromDirectory, const FileURL& source, int toDirectory,
                                        const FileURL& destination, const GoOn& goOn);
-    /// 0 or a negative errno: the source then has its name still, or is a hidden leftover.
-    int removeMovedSource(int fromDirectory, const FileURL& source, int toDirectory, const GoOn& goOn);
+    /// After an error the source has its name still, or is a hidden leftover.
+    Errno removeMovedSource(int fromDirectory, const FileURL& source, int toDirectory, const GoOn& goOn);
     Result<bool> sourceIsMissing(const FileURL& source);
     /// Copies beside the destination and renames, so that a partial copy never has the final name.
     Result<void> copyTree(int fromDirectory, const FileURL& source, int toDirectory, const FileURL& destination,
@@ -203,10 +203,9 @@ private:
     Result<void> giveNewDirectory(int directory, const std::string& path, const DirectoryAttributes& attributes);
     /// To one that was there: judges it first.
     Result<void> mendDirectory(int directory, const FileURL& url, const DirectoryAttributes& attributes);
-    /// 0 or an errno.
-    int setClass(int fd, int protectionClass);
+    Errno setClass(int fd, int protectionClass);
     /// The error for which a class could not be set.
-    static Result<void> classSet(int failure, const std::string& path, int protectionClass);
+    static Result<void> classSet(Errno failure, const std::string& path, int protectionClass);
     /// The user to whom a directory for `owner` belongs in the end.
     [[nodiscard]] uid_t ownerToBe(std::uint32_t owner) const;
     struct Standard {

@@ -48,19 +48,18 @@ bool namesAreOf(uid_t owner, int directory) {
 
 Result<void> ZORFileManager::removeItemAtURL(const std::optional<FileURL>& url) {
     if (!url)
-        return posixError(ZOR_HERE, EFAULT, "nil url passed to -removeItemAtURL:error:");
+        return posixError(ZOR_HERE, Errno(EFAULT), "nil url passed to -removeItemAtURL:error:");
     const auto parent = resolver_.openParent(*url);
     if (!parent && parent.error() == ENOENT)
         return {};
     if (!parent)
-        return posixError(ZOR_HERE, parent.error(), "prunetree of %s failed: %s", url->c_str(),
-                          errorText(parent.error()));
+        return posixError(ZOR_HERE, parent.error(), "prunetree of %s failed: %s", url->c_str(), parent.error().text());
     return removeItemIn(parent->directory.get(), *url);
 }
 
 Result<void> ZORFileManager::removeItemIn(int directory, const FileURL& url,
                                           const std::function<bool(int directory)>& isMeant) {
-    int firstError = 0;
+    Errno firstError;
     static constexpr const char* function = "removeItemAtURL";
     fs::RemoveCallbacks callbacks;
     callbacks.isMeant = isMeant;
@@ -71,34 +70,35 @@ Result<void> ZORFileManager::removeItemIn(int directory, const FileURL& url,
         const std::string path = below(url, failure.path);
         if (failure.error != ENOENT)
             log_.write(logLevelError, function, "prunetree hit error for %s : %s", ZOR_SHOWN(path),
-                       errorText(failure.error));
+                       failure.error.text());
         struct stat status{};
-        const int unexamined =
+        const Errno unexamined =
             failure.error == EPERM ? fs::statusOfName(failure.parent, failure.name, status) : failure.error;
-        const bool examined = unexamined == 0;
+        const bool examined = !unexamined;
         if (failure.error == EPERM && !examined)
             log_.write(logLevelError, function, "Failed to stat %s before unsetting UF_IMMUTABLE: %s", ZOR_SHOWN(path),
-                       errorText(unexamined));
+                       unexamined.text());
         if (examined) {
-            const int cleared = fs::clearImmutable(disk_, failure.parent, failure.name);
-            if (cleared < 0)
-                log_.write(logLevelError, function, "Failed to lchflags %s: %s", ZOR_SHOWN(path), errorText(-cleared));
-            if (cleared == 1) {
+            const auto cleared = fs::clearImmutable(disk_, failure.parent, failure.name);
+            if (!cleared)
+                log_.write(logLevelError, function, "Failed to lchflags %s: %s", ZOR_SHOWN(path),
+                           cleared.error().text());
+            if (cleared.value_or(false)) {
                 log_.write(logLevelNotice, function, "Unset UF_IMMUTABLE on %s", ZOR_SHOWN(path));
-                const int removed = disk_.unlinkFile(failure.parent, failure.name);
-                if (removed == 0)
+                const Errno removed = disk_.unlinkFile(failure.parent, failure.name);
+                if (!removed)
                     return;
-                log_.write(logLevelError, function, "unlink of %s failed: %s", ZOR_SHOWN(path), errorText(-removed));
+                log_.write(logLevelError, function, "unlink of %s failed: %s", ZOR_SHOWN(path), removed.text());
             }
         }
-        if (firstError == 0)
+        if (!firstError)
             firstError = failure.error;
     };
-    const int status = fs::removeTree(disk_, directory, std::string(url.lastPathComponent()).c_str(), callbacks);
-    const int number = status < 0 && status != -ENOENT ? -status : firstError;
-    if (number == 0 || number == ENOENT)
+    const Errno status = fs::removeTree(disk_, directory, std::string(url.lastPathComponent()).c_str(), callbacks);
+    const Errno number = status && status != ENOENT ? status : firstError;
+    if (!number || number == ENOENT)
         return {};
-    return posixError(ZOR_HERE, number, "prunetree of %s failed: %s", url.c_str(), errorText(number));
+    return posixError(ZOR_HERE, number, "prunetree of %s failed: %s", url.c_str(), number.text());
 }
 
 Result<void> ZORFileManager::copyItemAtURL(const FileURL& source, const FileURL& destination) {
@@ -119,11 +119,11 @@ Result<void> ZORFileManager::moveItemIfExistsAtURL(const FileURL& source, const 
 
 Result<bool> ZORFileManager::sourceIsMissing(const FileURL& source) {
     struct stat status{};
-    const int failure = resolver_.status(source, status);
-    if (failure != 0 && failure != ENOENT)
-        return posixError(ZOR_HERE, failure, "stat of %s failed: %s", source.c_str(), errorText(failure));
+    const Errno failure = resolver_.status(source, status);
+    if (failure && failure != ENOENT)
+        return posixError(ZOR_HERE, failure, "stat of %s failed: %s", source.c_str(), failure.text());
     if (failure == ENOENT && fs::hiddenBy(resolver_, disk_, source))
-        return posixError(ZOR_HERE, ENOKEY, "stat of %s failed: %s", source.c_str(), errorText(ENOKEY));
+        return posixError(ZOR_HERE, Errno(ENOKEY), "stat of %s failed: %s", source.c_str(), Errno(ENOKEY).text());
     return failure == ENOENT;
 }
 
@@ -133,9 +133,9 @@ Result<void> ZORFileManager::_copyItemAtURL(const FileURL& source, const FileURL
     const auto from = resolver_.openParent(source);
     const auto to = resolver_.openParent(destination);
     if (!from || !to) {
-        const int number = from ? to.error().number() : from.error().number();
+        const Errno number = from ? to.error() : from.error();
         return posixError({"copyTree", __LINE__}, number, "clonetree of %s to %s failed: %s", source.c_str(),
-                          destination.c_str(), errorText(number));
+                          destination.c_str(), number.text());
     }
     return copyTree(from->directory.get(), source, to->directory.get(), destination, {});
 }
@@ -143,24 +143,24 @@ Result<void> ZORFileManager::_copyItemAtURL(const FileURL& source, const FileURL
 Result<void> ZORFileManager::copyTree(int fromDirectory, const FileURL& source, int toDirectory,
                                       const FileURL& destination, const GoOn& goOn) {
     const std::string hidden = fs::uniqueName(fs::copyPrefix);
-    int status = fs::copyTree(disk_, fromDirectory, std::string(source.lastPathComponent()).c_str(), toDirectory,
-                              hidden.c_str(), goOn);
-    if (status == -ECANCELED) // who is to end does not stay to tidy up
-        return posixError(ZOR_HERE, ECANCELED, "clonetree of %s to %s was stopped", source.c_str(),
+    Errno status = fs::copyTree(disk_, fromDirectory, std::string(source.lastPathComponent()).c_str(), toDirectory,
+                                hidden.c_str(), goOn);
+    if (status == ECANCELED) // who is to end does not stay to tidy up
+        return posixError(ZOR_HERE, Errno(ECANCELED), "clonetree of %s to %s was stopped", source.c_str(),
                           destination.c_str());
     // Nothing of a copy may be missing once it has its name, whatever the power does.
-    if (status == 0) {
+    if (!status) {
         const auto copied = platform::openBeneath(toDirectory, ".", O_RDONLY | O_DIRECTORY);
-        status = copied ? disk_.syncFileSystem(copied->get()) : -copied.error().number();
+        status = copied ? disk_.syncFileSystem(copied->get()) : copied.error();
     }
-    if (status == 0)
+    if (!status)
         status = disk_.rename(toDirectory, hidden.c_str(), toDirectory,
                               std::string(destination.lastPathComponent()).c_str(), 0);
-    if (status < 0)
-        fs::removeTree(disk_, toDirectory, hidden.c_str());
-    if (status < 0)
-        return posixError(ZOR_HERE, -status, "clonetree of %s to %s failed: %s", source.c_str(), destination.c_str(),
-                          errorText(-status));
+    if (status)
+        (void)fs::removeTree(disk_, toDirectory, hidden.c_str());
+    if (status)
+        return posixError(ZOR_HERE, status, "clonetree of %s to %s failed: %s", source.c_str(), destination.c_str(),
+                          status.text());
     return {};
 }
 
@@ -172,7 +172,7 @@ Result<void> ZORFileManager::_moveItemAtURL(const FileURL& source, const FileURL
     const auto to = resolver_.openParent(destination);
     if (!from || !to)
         return posixError(ZOR_HERE, from ? to.error() : from.error(), "rename of %s to %s failed: %s", source.c_str(),
-                          destination.c_str(), errorText(from ? to.error() : from.error()));
+                          destination.c_str(), (from ? to.error() : from.error()).text());
     TRY(moveItem(from->directory.get(), source, to->directory.get(), destination, goOn));
     return {};
 }
@@ -190,37 +190,33 @@ Result<ZORFileManager::Moved> ZORFileManager::moveItem(int fromDirectory, const 
 
 Result<void> ZORFileManager::renameItem(int fromDirectory, const FileURL& source, int toDirectory,
                                         const FileURL& destination) {
-    const int status = disk_.rename(fromDirectory, std::string(source.lastPathComponent()).c_str(), toDirectory,
-                                    std::string(destination.lastPathComponent()).c_str(), 0);
-    if (status == 0)
+    const Errno status = disk_.rename(fromDirectory, std::string(source.lastPathComponent()).c_str(), toDirectory,
+                                      std::string(destination.lastPathComponent()).c_str(), 0);
+    if (!status)
         return {};
-    return posixError({"moveItem", __LINE__}, -status, "rename of %s to %s failed: %s", source.c_str(),
-                      destination.c_str(), errorText(-status));
+    return posixError({"moveItem", __LINE__}, status, "rename of %s to %s failed: %s", source.c_str(),
+                      destination.c_str(), status.text());
 }
 
 Result<void> ZORFileManager::moveAcrossFileSystems(int fromDirectory, const FileURL& source, int toDirectory,
                                                    const FileURL& destination, const GoOn& goOn) {
     TRY(copyTree(fromDirectory, source, toDirectory, destination, goOn));
-    const int removed = removeMovedSource(fromDirectory, source, toDirectory, goOn);
-    if (removed < 0 && removed != -ECANCELED)
-        log_.write(logLevelError, __func__, "Failed to remove source %s : %s", source.c_str(), errorText(-removed));
+    const Errno removed = removeMovedSource(fromDirectory, source, toDirectory, goOn);
+    if (removed && removed != ECANCELED)
+        log_.write(logLevelError, __func__, "Failed to remove source %s : %s", source.c_str(), removed.text());
     return {};
 }
 
-int ZORFileManager::removeMovedSource(int fromDirectory, const FileURL& source, int toDirectory, const GoOn& goOn) {
-    const auto synced = [this](int directory) {
-        const auto listing = platform::openBeneath(directory, ".", O_RDONLY | O_DIRECTORY); // it may be O_PATH
-        return listing ? disk_.sync(listing->get()) : -listing.error().number();
+Errno ZORFileManager::removeMovedSource(int fromDirectory, const FileURL& source, int toDirectory, const GoOn& goOn) {
+    const auto synced = [this](int directory) -> Errno {
+        return disk_.sync(TRY(platform::openBeneath(directory, ".", O_RDONLY | O_DIRECTORY)).get()); // it may be O_PATH
     };
     const std::string hidden = fs::uniqueName(fs::copyPrefix);
     // The source leaves its name in one step, when the copy cannot lose its own any more; only then it is taken apart.
-    int status = synced(toDirectory);
-    if (status == 0)
-        status = disk_.rename(fromDirectory, std::string(source.lastPathComponent()).c_str(), fromDirectory,
-                              hidden.c_str(), 0);
-    if (status == 0)
-        status = synced(fromDirectory);
-    return status < 0 ? status : fs::removeTree(disk_, fromDirectory, hidden.c_str(), goOn);
+    TRY(synced(toDirectory));
+    TRY(disk_.rename(fromDirectory, std::string(source.lastPathComponent()).c_str(), fromDirectory, hidden.c_str(), 0));
+    TRY(synced(fromDirectory));
+    return fs::removeTree(disk_, fromDirectory, hidden.c_str(), goOn);
 }
 
 Result<void> ZORFileManager::_traverseDirectory(const FileURL& url,
@@ -228,29 +224,29 @@ Result<void> ZORFileManager::_traverseDirectory(const FileURL& url,
     const auto parent = resolver_.openParent(url);
     if (!parent)
         return posixError(ZOR_HERE, parent.error(), "fts_open failed for %s with error %s", url.c_str(),
-                          errorText(parent.error()));
+                          parent.error().text());
     std::optional<ZORError> failure;
     // A directory is walked as itself: whether it may be a mount point, the way to it decides.
     const auto directory = resolver_.openDirectory(url);
     fs::TreeWalker walker;
-    const int status = walker.walk(directory ? directory->get() : parent->directory.get(),
-                                   directory ? "." : parent->name.c_str(), [&](const WalkEntry& entry) {
-                                       if (entry.kind == WalkEntryKind::noStatus) {
-                                           failure =
-                                               posixError({"_traverseDirectory", __LINE__}, entry.error,
-                                                          "Error for path %s: %s", url.c_str(), errorText(entry.error));
-                                           return WalkStep::stop;
-                                       }
-                                       if (auto answer = visitor(entry); !answer) {
-                                           failure = std::move(answer).error();
-                                           return WalkStep::stop;
-                                       }
-                                       return WalkStep::proceed;
-                                   });
+    const Errno status = walker.walk(directory ? directory->get() : parent->directory.get(),
+                                     directory ? "." : parent->name.c_str(), [&](const WalkEntry& entry) {
+                                         if (entry.kind == WalkEntryKind::noStatus) {
+                                             failure =
+                                                 posixError({"_traverseDirectory", __LINE__}, entry.error,
+                                                            "Error for path %s: %s", url.c_str(), entry.error.text());
+                                             return WalkStep::stop;
+                                         }
+                                         if (auto answer = visitor(entry); !answer) {
+                                             failure = std::move(answer).error();
+                                             return WalkStep::stop;
+                                         }
+                                         return WalkStep::proceed;
+                                     });
     if (failure)
         return *failure;
-    if (status < 0)
-        return posixError(ZOR_HERE, -status, "Error for path %s: %s", url.c_str(), errorText(-status));
+    if (status)
+        return posixError(ZOR_HERE, status, "Error for path %s: %s", url.c_str(), status.text());
     return {};
 }
 
@@ -258,14 +254,14 @@ void ZORFileManager::standardizeEntry(int parent, const char* name, int director
                                       Standard& standard, fs::NamesMet& namesMet) {
     constexpr const char* function = "standardizeOwnershipAtURL";
     const auto [uid, gid, formerOwner, others] = standard;
-    const auto notGiven = [&](int number) {
-        log_.write(logLevelError, function, "Could not chown %s: %s", ZOR_SHOWN(path), errorText(number));
+    const auto notGiven = [&](Errno number) {
+        log_.write(logLevelError, function, "Could not chown %s: %s", ZOR_SHOWN(path), number.text());
     };
     platform::FileDescriptor opened;
     if (directory < 0) {
         auto item = platform::openBeneathOnMount(parent, name, O_PATH | O_NOFOLLOW);
         if (!item && item.error() != ENOENT)
-            notGiven(item.error().number());
+            notGiven(item.error());
         if (!item)
             return;
         opened = std::move(*item);
@@ -274,7 +270,7 @@ void ZORFileManager::standardizeEntry(int parent, const char* name, int director
     const int item = directory < 0 ? opened.get() : directory;
     struct stat status{};
     if (::fstat(item, &status) != 0)
-        return notGiven(errno);
+        return notGiven(Errno::last());
     // The former owner can have named another's file or directory so that it lies here.
     if (daemon_ == 0 && status.st_uid != formerOwner && status.st_uid != uid) {
         if (others < othersSaidMax)
@@ -288,12 +284,12 @@ void ZORFileManager::standardizeEntry(int parent, const char* name, int director
     const bool sharedElsewhere =
         !S_ISDIR(status.st_mode) && status.st_nlink > 1 && !(namesAreOf(uid, parent) && namesMet.wasLast(status));
     if (!sharedElsewhere && (status.st_uid != uid || status.st_gid != gid))
-        if (const int changed = disk_.changeOwner(item, uid, gid); changed < 0)
-            notGiven(-changed);
+        if (const Errno changed = disk_.changeOwner(item, uid, gid))
+            notGiven(changed);
     if (sharedElsewhere || S_ISLNK(status.st_mode)) // Linux keeps no mode for a link
         return;
-    if (const int changed = disk_.changeMode(item, standardMode(status.st_mode)); changed < 0)
-        log_.write(logLevelError, function, "Could not chmod %s: %s", ZOR_SHOWN(path), errorText(-changed));
+    if (const Errno changed = disk_.changeMode(item, standardMode(status.st_mode)))
+        log_.write(logLevelError, function, "Could not chmod %s: %s", ZOR_SHOWN(path), changed.text());
 }
 
 Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid, uid_t formerOwner,
@@ -303,7 +299,7 @@ Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t
     fs::NamesMet namesMet;
     Result<void> walked = _traverseDirectory(url, [&](const WalkEntry& entry) -> Result<void> {
         if (goOn && !goOn())
-            return posixError({"standardizeOwnershipAtURL", __LINE__}, ECANCELED,
+            return posixError({"standardizeOwnershipAtURL", __LINE__}, Errno(ECANCELED),
                               "The change of owners below %s was stopped", url.c_str());
         const std::string path = below(url, entry.path());
         if (entry.kind != WalkEntryKind::directoryEnd && !entry.onOtherFileSystem &&
@@ -316,9 +312,9 @@ Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t
                    static_cast<unsigned long long>(standard.others - othersSaidMax), url.c_str());
     const auto parent = resolver_.openParent(url);
     struct stat status{};
-    const int failure = parent ? resolver_.status(url, status) : parent.error().number();
-    if (failure != 0)
-        return posixError(ZOR_HERE, failure, "Could not stat %s: %s", url.c_str(), errorText(failure));
+    const Errno failure = parent ? resolver_.status(url, status) : parent.error();
+    if (failure)
+        return posixError(ZOR_HERE, failure, "Could not stat %s: %s", url.c_str(), failure.text());
     fs::NamesMet again;              // the root's name has been counted
     standard.others = othersSaidMax; // the root has been said
     const auto directory = resolver_.openDirectoryPath(url);
@@ -344,12 +340,11 @@ Result<void> ZORFileManager::forEachItemInDirectoryAtURL(const FileURL& director
                                : opened.error() == ENOENT && fs::hiddenBy(resolver_, disk_, directory);
     if (opened && !hidden)
         return forEachItemIn(opened->get(), directory, leftovers, visitor);
-    const int number = hidden ? ENOKEY : opened.error().number();
+    const Errno number = hidden ? Errno(ENOKEY) : opened.error();
     if (number != ENOENT)
-        log_.write(logLevelError, "_IterateDirectory", "opendir of %s failed: %s", directory.c_str(),
-                   errorText(number));
+        log_.write(logLevelError, "_IterateDirectory", "opendir of %s failed: %s", directory.c_str(), number.text());
     return posixError({"urlsForItemsInDirectoryAtURL", __LINE__}, number, "_IterateDirectory for %s returned %s",
-                      directory.c_str(), errorText(number));
+                      directory.c_str(), number.text());
 }
 
 Result<void> ZORFileManager::forEachItemIn(int directory, const FileURL& url, Leftovers leftovers,
@@ -361,14 +356,14 @@ Result<void> ZORFileManager::forEachItemIn(int directory, const FileURL& url, Le
             continue;
         unsigned char type = entry->type;
         struct stat status{};
-        if (type == DT_UNKNOWN && fs::statusOfName(directory, entry->name, status) == 0)
+        if (type == DT_UNKNOWN && !fs::statusOfName(directory, entry->name, status))
             type = static_cast<unsigned char>(IFTODT(status.st_mode));
         if (!visitor(directory, type == DT_DIR ? url.appendingDirectory(entry->name) : url.appendingFile(entry->name)))
             return {};
     }
-    if (entries.error() != 0)
+    if (entries.error())
         return posixError({"urlsForItemsInDirectoryAtURL", __LINE__}, entries.error(),
-                          "_IterateDirectory for %s returned %s", url.c_str(), errorText(entries.error()));
+                          "_IterateDirectory for %s returned %s", url.c_str(), entries.error().text());
     return {};
 }
 
@@ -396,22 +391,21 @@ std::vector<FileURL> ZORFileManager::writeLeftoversInDirectoryAtURL(const FileUR
 void ZORFileManager::printDirectoryStructureAtURL(const FileURL& url) {
     const auto parent = resolver_.openParent(url);
     if (!parent) {
-        log_.write(logLevelError, __func__, "fts_open failed for %s : %s", url.c_str(), errorText(parent.error()));
+        log_.write(logLevelError, __func__, "fts_open failed for %s : %s", url.c_str(), parent.error().text());
         return;
     }
     constexpr const char* function = "printDirectoryStructureAtURL";
     fs::TreeWalker walker(fs::WalkStatus::typeOnly);
-    const int status = walker.walk(parent->directory.get(), parent->name.c_str(), [&](const WalkEntry& entry) {
+    const Errno status = walker.walk(parent->directory.get(), parent->name.c_str(), [&](const WalkEntry& entry) {
         const std::string path = below(url, entry.path());
         if (entry.kind == WalkEntryKind::unreadableDirectory || entry.kind == WalkEntryKind::noStatus)
-            log_.write(logLevelError, function, "FTS returned error for %s : %s", ZOR_SHOWN(path),
-                       errorText(entry.error));
+            log_.write(logLevelError, function, "FTS returned error for %s : %s", ZOR_SHOWN(path), entry.error.text());
         else if (entry.kind != WalkEntryKind::directoryEnd)
             log_.write(logLevelError, function, "\tOrphaned File: %s", ZOR_SHOWN(path));
         return WalkStep::proceed;
     });
-    if (status < 0)
-        log_.write(logLevelError, function, "FTS returned error for %s : %s", url.c_str(), errorText(-status));
+    if (status)
+        log_.write(logLevelError, function, "FTS returned error for %s : %s", url.c_str(), status.text());
 }
 
 std::uint64_t ZORFileManager::diskUsageForURL(const FileURL& url) {
@@ -426,8 +420,7 @@ std::uint64_t ZORFileManager::diskUsageForURL(const FileURL& url) {
 fs::Usage ZORFileManager::diskUsageOfDirectory(const fs::OpenResult& directory, const FileURL& url) {
     constexpr const char* function = "diskUsageForURL";
     if (!directory) {
-        log_.write(logLevelError, function, "Failed to open directory %s : %s", url.c_str(),
-                   errorText(directory.error()));
+        log_.write(logLevelError, function, "Failed to open directory %s : %s", url.c_str(), directory.error().text());
         return {.bytes = 0, .cutShort = isOwnShortage(directory.error())};
     }
     fs::UsageLog usageLog;

@@ -62,8 +62,8 @@ private:
     /// The descriptor of a subdirectory that a deeper one lies in: the layout names it first.
     [[nodiscard]] int madeBefore(std::string_view subdirectory) const;
     [[nodiscard]] bool holdsOthers(std::string_view subdirectory) const;
-    ZORError topLevelError(Here here, int number, const char* verb);
-    ZORError subdirectoryError(Here here, const char* subdirectory, int number, const char* verb);
+    ZORError topLevelError(Here here, Errno error, const char* verb);
+    ZORError subdirectoryError(Here here, const char* subdirectory, Errno error, const char* verb);
     Result<void> giveAway(const Made& made, const char* subdirectory);
 
     const Log& log_;
@@ -77,28 +77,28 @@ private:
     platform::FileDescriptor metadata_;
 };
 
-ZORError ContainerBuilder::topLevelError(Here here, int number, const char* verb) {
-    const ZORError cause = posixError(here, number, "%s of %s failed: %s", verb, staging_.c_str(), errorText(number));
+ZORError ContainerBuilder::topLevelError(Here here, Errno error, const char* verb) {
+    const ZORError cause = posixError(here, error, "%s of %s failed: %s", verb, staging_.c_str(), error.text());
     return makeError(log_, here, ErrorCode::stagingDirectoryFailed, &cause, LogFlag::yes,
                      "Failed to create staging dir at %s : %s", staging_.c_str(), cause.text().c_str());
 }
 
-ZORError ContainerBuilder::subdirectoryError(Here here, const char* subdirectory, int number, const char* verb) {
+ZORError ContainerBuilder::subdirectoryError(Here here, const char* subdirectory, Errno error, const char* verb) {
     const ZORError cause =
-        posixError(here, number, "%s of %s/%s failed: %s", verb, staging_.c_str(), subdirectory, errorText(number));
+        posixError(here, error, "%s of %s/%s failed: %s", verb, staging_.c_str(), subdirectory, error.text());
     return makeError(log_, here, ErrorCode::subdirectoryFailed, &cause, LogFlag::yes,
                      "Failed to create sub-dir at %s%s", staging_.c_str(), subdirectory);
 }
 
 Result<void> ContainerBuilder::_createTopLevelContainerDirectory() {
     const std::string name(staging_.lastPathComponent());
-    if (const int made = disk_.makeDirectory(parent_, name.c_str(), closedMode); made < 0)
-        return topLevelError(ZOR_HERE, -made, "mkdir");
+    if (const Errno made = disk_.makeDirectory(parent_, name.c_str(), closedMode))
+        return topLevelError(ZOR_HERE, made, "mkdir");
     auto directory = openBeneath(parent_, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!directory)
-        return topLevelError(ZOR_HERE, directory.error().number(), "opendir");
+        return topLevelError(ZOR_HERE, directory.error(), "opendir");
     directory_ = std::move(*directory);
-    if (const int failed = fileManager_.setClassOfNew(directory_.get(), layout_.topLevelProtectionClass))
+    if (const Errno failed = fileManager_.setClassOfNew(directory_.get(), layout_.topLevelProtectionClass))
         return topLevelError(ZOR_HERE, failed, "setclass");
     return {};
 }
@@ -124,14 +124,14 @@ Result<void> ContainerBuilder::_createSubDirectories() {
         const std::size_t slash = path.rfind('/');
         const int parent = slash == path.npos ? directory_.get() : madeBefore(path.substr(0, slash));
         const char* name = subdirectory + (slash == path.npos ? 0 : slash + 1);
-        if (const int made = disk_.makeDirectory(parent, name, layout_.subdirectoryMode); made < 0)
-            return subdirectoryError(ZOR_HERE, subdirectory, -made, "mkdir");
+        if (const Errno made = disk_.makeDirectory(parent, name, layout_.subdirectoryMode))
+            return subdirectoryError(ZOR_HERE, subdirectory, made, "mkdir");
         Made& made = subdirectories_.emplace_back(Made{.parent = parent, .name = name, .opened = {}});
         if (!holdsOthers(path))
             continue;
         auto opened = openBeneath(parent, name, O_PATH | O_DIRECTORY | O_NOFOLLOW);
         if (!opened)
-            return subdirectoryError(ZOR_HERE, subdirectory, opened.error().number(), "opendir");
+            return subdirectoryError(ZOR_HERE, subdirectory, opened.error(), "opendir");
         made.opened = std::move(*opened);
     }
     return {};
@@ -139,58 +139,56 @@ Result<void> ContainerBuilder::_createSubDirectories() {
 
 Result<void> ContainerBuilder::writeMetadata(const ZORMetadata& record) {
     const auto bytes = plist::writeBinary(record.fileContent());
-    int status = bytes ? -EFBIG : -EINVAL;
-    // A file that no reader would take must not be acknowledged.
-    if (bytes && bytes->size() <= fs::metadataFileBytesMax)
-        status = fs::writeNewFile(disk_, directory_.get(), names::metadataFile, metadataMode, *bytes);
-    if (status >= 0) {
-        metadata_ = FileDescriptor(status);
-        status = -fileManager_.setClassOfNew(metadata_.get(), classWithoutProtection);
-    }
-    if (status >= 0)
+    const auto written = [&]() -> Errno {
+        // A file that no reader would take must not be acknowledged.
+        if (!bytes || bytes->size() > fs::metadataFileBytesMax)
+            return Errno(bytes ? EFBIG : EINVAL);
+        metadata_ = TRY(fs::writeNewFile(disk_, directory_.get(), names::metadataFile, metadataMode, *bytes));
+        return fileManager_.setClassOfNew(metadata_.get(), classWithoutProtection);
+    }();
+    if (!written)
         return {};
-    const ZORError cause = posixError(ZOR_HERE, -status, "write of %s failed: %s", names::metadataFile,
-                                      bytes ? errorText(-status) : bytes.error().reason);
+    const ZORError cause = posixError(ZOR_HERE, written, "write of %s failed: %s", names::metadataFile,
+                                      bytes ? written.text() : bytes.error().reason);
     return makeError(log_, ZOR_HERE, ErrorCode::propertyListNotWritten, &cause, LogFlag::yes,
                      "Failed to write metadata dictionary to URL %s", staging_.c_str());
 }
 
 Result<void> ContainerBuilder::giveAway(const Made& made, const char* subdirectory) {
     struct stat status{};
-    int failure = fs::statusOfName(made.parent, made.name, status);
+    Errno error = fs::statusOfName(made.parent, made.name, status);
     const char* verb = "lstat";
     // The process's umask, or what the directory hands down, may have changed the mode.
-    if (failure == 0 && (status.st_mode & permissionBits) != layout_.subdirectoryMode) {
+    if (!error && (status.st_mode & permissionBits) != layout_.subdirectoryMode) {
         const auto opened = openBeneath(made.parent, made.name, O_PATH | O_DIRECTORY | O_NOFOLLOW);
-        failure = opened ? -disk_.changeMode(opened->get(), layout_.subdirectoryMode) : opened.error().number();
+        error = opened ? disk_.changeMode(opened->get(), layout_.subdirectoryMode) : opened.error();
         verb = "chmod";
     }
-    if (const std::uint32_t owner = layout_.subdirectoryOwner; failure == 0 && owner != ownerUnchanged) {
-        failure = -disk_.changeOwnerOf(made.parent, made.name, owner, owner);
+    if (const std::uint32_t owner = layout_.subdirectoryOwner; !error && owner != ownerUnchanged) {
+        error = disk_.changeOwnerOf(made.parent, made.name, owner, owner);
         verb = "chown";
     }
-    return failure == 0 ? Result<void>() : subdirectoryError(ZOR_HERE, subdirectory, failure, verb);
+    return error ? Result<void>(subdirectoryError(ZOR_HERE, subdirectory, error, verb)) : Result<void>();
 }
 
 Result<void> ContainerBuilder::giveAway() {
     for (std::size_t i = subdirectories_.size(); i-- > 0;)
         TRY(giveAway(subdirectories_[i], layout_.subdirectories[i]));
     const std::uint32_t owner = layout_.topLevelOwner;
-    int status = owner == ownerUnchanged ? 0 : disk_.changeOwner(directory_.get(), owner, owner);
+    Errno error = owner == ownerUnchanged ? Errno() : disk_.changeOwner(directory_.get(), owner, owner);
     const char* verb = "chown";
-    if (status == 0) {
-        status = disk_.changeMode(directory_.get(), layout_.topLevelMode);
+    if (!error) {
+        error = disk_.changeMode(directory_.get(), layout_.topLevelMode);
         verb = "chmod";
     }
-    return status == 0 ? Result<void>() : topLevelError(ZOR_HERE, -status, verb);
+    return error ? Result<void>(topLevelError(ZOR_HERE, error, verb)) : Result<void>();
 }
 
 Result<void> ContainerBuilder::orderBeforeMove(const fs::Durability& durability) {
-    const int status = durability.beforeMove(metadata_.get());
-    if (status == 0)
+    const Errno error = durability.beforeMove(metadata_.get());
+    if (!error)
         return {};
-    const ZORError cause =
-        posixError(ZOR_HERE, -status, "sync of %s failed: %s", names::metadataFile, errorText(-status));
+    const ZORError cause = posixError(ZOR_HERE, error, "sync of %s failed: %s", names::metadataFile, error.text());
     return makeError(log_, ZOR_HERE, ErrorCode::propertyListNotWritten, &cause, LogFlag::yes,
                      "Failed to write metadata dictionary to URL %s", staging_.c_str());
 }
@@ -269,7 +267,7 @@ Result<ContainerMaker::Placed> ContainerMaker::moveIntoPlace(const Built& built,
         // A container that was looked for in one home is not made in another.
         const UserHome* const home = isPerUserClass(containerClass) ? needs_.configuration.homeOf(userId) : nullptr;
         if (!classDirectory || (home && home->generation() != homeGeneration))
-            return posixError(here, ENOENT, "the home of user %u is not there, or has just changed", userId);
+            return posixError(here, Errno(ENOENT), "the home of user %u is not there, or has just changed", userId);
         live = classDirectory->url.appendingDirectory(wellKnown ? std::string_view(*wellKnown)
                                                                 : staging.lastPathComponent());
         if (!classDirectory->opened)

@@ -104,7 +104,7 @@ Result<DeathRow::Row> DeathRow::condemn(const FileURL& url, const FileURL& desti
     if (!from || !to) {
         const Errno error = from ? to.error() : from.error();
         return posixError({moveFunction, __LINE__}, error, "open of %s failed: %s",
-                          (from ? destination : url).deletingLastPathComponent().c_str(), errorText(error));
+                          (from ? destination : url).deletingLastPathComponent().c_str(), error.text());
     }
     if (owner)
         TRY(judgeOwner(from->directory.get(), url, *owner));
@@ -128,11 +128,11 @@ Result<DeathRow::Row> DeathRow::condemn(const FileURL& url, const FileURL& desti
 Result<void> DeathRow::hideBesideItself(int from, const FileURL& url, std::optional<std::uint32_t> owner) {
     // Its name is one that boots know, and that no listing shows.
     const FileURL hidden = url.deletingLastPathComponent().appendingDirectory(fs::uniqueName(fs::copyPrefix));
-    const int renamed = needs_.fileManager.disk().rename(from, std::string(url.lastPathComponent()).c_str(), from,
-                                                         std::string(hidden.lastPathComponent()).c_str(), 0);
-    if (renamed < 0)
-        return posixError({moveFunction, __LINE__}, -renamed, "rename of %s to %s failed: %s", url.c_str(),
-                          hidden.c_str(), errorText(-renamed));
+    const Errno renamed = needs_.fileManager.disk().rename(from, std::string(url.lastPathComponent()).c_str(), from,
+                                                           std::string(hidden.lastPathComponent()).c_str(), 0);
+    if (renamed)
+        return posixError({moveFunction, __LINE__}, renamed, "rename of %s to %s failed: %s", url.c_str(),
+                          hidden.c_str(), renamed.text());
     if (owner)
         TRY(putBackIfAnothers(from, url, from, hidden, *owner));
     {
@@ -146,7 +146,7 @@ Result<void> DeathRow::condemnOnItsFileSystem(int from, const FileURL& url, std:
     ZORFileManager& fileManager = needs_.fileManager;
     const auto failed = [&](const FileURL& row, Errno error) {
         return posixError({moveFunction, __LINE__}, error, "death row %s cannot be used: %s", row.c_str(),
-                          errorText(error));
+                          error.text());
     };
     const auto top = fs::topOfMount(fileManager.resolver(), url.deletingLastPathComponent());
     if (!top)
@@ -175,15 +175,15 @@ Result<void> DeathRow::judgeOwner(int directory, const FileURL& url, std::uint32
     struct stat status{};
     if (!item || ::fstat(item->get(), &status) != 0) {
         const Errno error = item ? Errno::last() : item.error() == EXDEV ? Errno(EBUSY) : item.error();
-        return posixError({moveFunction, __LINE__}, error, "open of %s failed: %s", url.c_str(), errorText(error));
+        return posixError({moveFunction, __LINE__}, error, "open of %s failed: %s", url.c_str(), error.text());
     }
     // A power cut may have kept a directory that the daemon made and lost who was to own it. An empty one is nobody's
     // loss.
     const bool isHalfMade = status.st_uid == ::geteuid() && S_ISDIR(status.st_mode);
-    if (!isAnothers(status, owner) || (isHalfMade && needs_.fileManager.disk().removeDirectory(
-                                                         directory, std::string(url.lastPathComponent()).c_str()) == 0))
+    if (!isAnothers(status, owner) || (isHalfMade && !needs_.fileManager.disk().removeDirectory(
+                                                         directory, std::string(url.lastPathComponent()).c_str())))
         return {};
-    return posixError({moveFunction, __LINE__}, notTheContainer,
+    return posixError({moveFunction, __LINE__}, Errno(notTheContainer),
                       "%s belongs to user %u: it is not the container, which is user %u's", url.c_str(), status.st_uid,
                       owner);
 }
@@ -198,15 +198,16 @@ Result<void> DeathRow::putBackIfAnothers(int from, const FileURL& url, int to, c
     const std::string before(url.lastPathComponent());
     // Its place may have been taken meanwhile.
     std::string back = before;
-    int renamed = disk.rename(to, name.c_str(), from, back.c_str(), RENAME_NOREPLACE);
-    if (renamed < 0) {
+    Errno renamed = disk.rename(to, name.c_str(), from, back.c_str(), RENAME_NOREPLACE);
+    if (renamed) {
         back = fs::uniqueName(before + ".");
         renamed = disk.rename(to, name.c_str(), from, back.c_str(), 0);
     }
     needs_.log.write(logLevelError, moveFunction, "A directory of user %u was put in the place of %s; %s %s%s%s",
-                     status.st_uid, url.c_str(), renamed == 0 ? "it is back as" : "it could not be put back as",
-                     ZOR_SHOWN(back), renamed == 0 ? "" : ": ", renamed == 0 ? "" : errorText(-renamed));
-    return posixError({moveFunction, __LINE__}, notTheContainer, "%s was swapped while it was taken away", url.c_str());
+                     status.st_uid, url.c_str(), renamed ? "it could not be put back as" : "it is back as",
+                     ZOR_SHOWN(back), renamed ? ": " : "", renamed ? renamed.text() : "");
+    return posixError({moveFunction, __LINE__}, Errno(notTheContainer), "%s was swapped while it was taken away",
+                      url.c_str());
 }
 
 } // namespace zor

@@ -31,15 +31,12 @@ const char* undeletedMark() {
     return ::geteuid() == 0 ? names::undeletedAttribute : names::undeletedAttributeUser;
 }
 
-/// Root's alone and marked, so that a later pass finds it. 0 or an errno.
-int closeAndMark(platform::Disk& disk, int directory) {
+/// Root's alone and marked, so that a later pass finds it.
+Errno closeAndMark(platform::Disk& disk, int directory) {
     static constexpr std::uint8_t mark[] = {'1'};
-    int status = disk.changeOwner(directory, ::geteuid(), ::getegid());
-    if (status == 0)
-        status = disk.changeMode(directory, closedMode);
-    if (status == 0)
-        status = disk.setAttribute(directory, undeletedMark(), mark);
-    return -status;
+    TRY(disk.changeOwner(directory, ::geteuid(), ::getegid()));
+    TRY(disk.changeMode(directory, closedMode));
+    return disk.setAttribute(directory, undeletedMark(), mark);
 }
 
 /// Whether an open directory is what closeAndMark made of it.
@@ -109,10 +106,10 @@ Result<void> DeathRow::forEachCondemned(int directory, const FileURL& row,
     const auto listed = needs_.fileManager.forEachItemIn(
         directory, row, ZORFileManager::Leftovers::shown, [&](int, const FileURL& item) {
             // A power cut could bring back a container that is half removed where nothing keeps the order of changes.
-            const int status = first ? needs_.durability.beforeRemoval(directory) : 0;
+            const Errno error = first ? needs_.durability.beforeRemoval(directory) : Errno();
             first = false;
-            if (status < 0) {
-                unsynced = posixError(here, -status, "sync of %s failed: %s", row.c_str(), errorText(-status));
+            if (error) {
+                unsynced = posixError(here, error, "sync of %s failed: %s", row.c_str(), error.text());
                 return false;
             }
             {
@@ -137,7 +134,7 @@ void DeathRow::deleteEverythingOnDeathRow(Pass& pass) {
                      opened->get(), deathRow, [&](const FileURL& item) { return _removeItemOrMoveToTempAtURL(item); },
                      pass)
                : Result<void>(posixError({passFunction, __LINE__}, opened.error(), "opendir of %s failed: %s",
-                                         deathRow.c_str(), errorText(opened.error())));
+                                         deathRow.c_str(), opened.error().text()));
     if (emptied)
         return;
     pass.last = emptied.error().isPosix(ENOENT)
@@ -213,9 +210,9 @@ Result<void> DeathRow::moveToTemporary(const FileURL& url, const FileURL& destin
     const auto to = fileManager.resolver().openParent(destination);
     Errno error = !item ? item.error() : !from ? from.error() : !to ? to.error() : Errno();
     if (!error)
-        error = Errno(closeAndMark(fileManager.disk(), item->get()));
+        error = closeAndMark(fileManager.disk(), item->get());
     if (error)
-        return posixError(ZOR_HERE, error, "closing of %s failed: %s", url.c_str(), errorText(error));
+        return posixError(ZOR_HERE, error, "closing of %s failed: %s", url.c_str(), error.text());
     TRY(fileManager.renameItem(from->directory.get(), url, to->directory.get(), destination));
     if (inTemporary_)
         inTemporary_->emplace(destination.lastPathComponent());

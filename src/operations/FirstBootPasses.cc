@@ -109,7 +109,7 @@ bool FirstBootPasses::migrateGroupIdentifiers(const ZORMetadata& container) {
 std::optional<std::set<std::string, std::less<>>> FirstBootPasses::ownersOfSystemContainers() {
     // An identifier that was lost with the file is not known to be unentitled.
     if (const auto lost = needs_.entitlements.lostFile()) {
-        const ZORError error = posixError({reconcileFunction, __LINE__}, EIO,
+        const ZORError error = posixError({reconcileFunction, __LINE__}, Errno(EIO),
                                           "the entitlement file could not be read and lies at %s", lost->c_str());
         needs_.log.write(logLevelError, reconcileFunction, "Failed to fetch system container list: %s",
                          error.text().c_str());

@@ -32,7 +32,7 @@ Result<void> InfoValues::checkInfoShare(const Caller& caller, const ZORMetadata&
     if (held + bytes - before <= needs_.limits.infoBytesMaxPerUser)
         return {};
     const ZORError cause =
-        posixError({setFunction, __LINE__}, EDQUOT,
+        posixError({setFunction, __LINE__}, Errno(EDQUOT),
                    "the info values of user %u's containers take %llu bytes, and no more may be kept", record.uid(),
                    static_cast<unsigned long long>(held));
     return makeError(needs_.log, {setFunction, __LINE__}, ErrorCode::propertyListNotWritten, &cause, LogFlag::yes,

@@ -16,9 +16,9 @@ std::optional<ZORError> LastingMoves::syncDirectories(std::vector<FileURL> chang
     const platform::BlockingScope blocking;
     for (const FileURL& url : changed) {
         const auto directory = fileManager_.resolver().openDirectory(url);
-        const int status = directory ? durability_.afterMove(directory->get()) : -directory.error().number();
-        if (status < 0)
-            return posixError(ZOR_HERE, -status, "sync of %s failed: %s", url.c_str(), errorText(-status));
+        const Errno error = directory ? durability_.afterMove(directory->get()) : directory.error();
+        if (error)
+            return posixError(ZOR_HERE, error, "sync of %s failed: %s", url.c_str(), error.text());
     }
     return std::nullopt;
 }
@@ -27,19 +27,17 @@ std::optional<ZORError> LastingMoves::syncDirectory(const platform::FileDescript
                                                     const FileURL& moved) const {
     const platform::BlockingScope blocking;
     const auto listing = platform::openBeneath(directory.get(), ".", O_RDONLY | O_DIRECTORY);
-    const int status = listing ? durability_.afterMove(listing->get()) : -listing.error().number();
-    if (status < 0)
-        return posixError(ZOR_HERE, -status, "sync of %s failed: %s", moved.deletingLastPathComponent().c_str(),
-                          errorText(-status));
+    const Errno error = listing ? durability_.afterMove(listing->get()) : listing.error();
+    if (error)
+        return posixError(ZOR_HERE, error, "sync of %s failed: %s", moved.deletingLastPathComponent().c_str(),
+                          error.text());
     return std::nullopt;
 }
 
-int LastingMoves::orderBetween(const FileURL& changed, const FileURL& next) const {
-    const auto first = fileManager_.resolver().openDirectory(changed);
-    const auto second = fileManager_.resolver().openDirectory(next);
-    if (!first || !second)
-        return -(first ? second.error() : first.error()).number();
-    return durability_.between(first->get(), second->get());
+Errno LastingMoves::orderBetween(const FileURL& changed, const FileURL& next) const {
+    const platform::FileDescriptor first = TRY(fileManager_.resolver().openDirectory(changed));
+    const platform::FileDescriptor second = TRY(fileManager_.resolver().openDirectory(next));
+    return durability_.between(first.get(), second.get());
 }
 
 ZORError LastingMoves::notLasting(const char* function, ErrorCode code, const FileURL& container,

@@ -9,6 +9,7 @@
 #include "base/ZORError.h"
 #include "fs/Durability.h"
 #include "fs/ZORFileManager.h"
+#include "platform/Errno.h"
 
 #include <optional>
 #include <vector>
@@ -27,8 +28,8 @@ public:
     /// The same of the open directory that holds `moved`; O_PATH will do.
     [[nodiscard]] std::optional<ZORError> syncDirectory(const platform::FileDescriptor& directory,
                                                         const FileURL& moved) const;
-    /// A change in one directory is on the disk before the next one in the other can be. 0 or a negative errno.
-    [[nodiscard]] int orderBetween(const FileURL& changed, const FileURL& next) const;
+    /// A change in one directory is on the disk before the next one in the other can be.
+    Errno orderBetween(const FileURL& changed, const FileURL& next) const;
     /// The error of a container whose move into its place could not be synced, logged. The record says so until one is.
     [[nodiscard]] ZORError notLasting(const char* function, ErrorCode code, const FileURL& container,
                                       const ZORError& cause) const;

@@ -63,12 +63,12 @@ Result<void> Replace::replaceOnce(const ReplaceRequest& request, Progress& progr
     const platform::BlockingScope blocking;
     const int dest = progress.directories.dest.get();
     // A journal that came back with the power would undo what comes to the new one later.
-    const int synced = needs_.moves.durability().afterMoves(
+    const Errno synced = needs_.moves.durability().afterMoves(
         dest, progress.hasMovedByJournal() ? progress.prepared.journals.get() : dest);
-    if (synced < 0)
+    if (synced)
         return needs_.moves.notLasting(replaceFunction, ErrorCode::newNotMovedIntoPlace, progress.destUrl,
-                                       posixError({replaceFunction, __LINE__}, -synced, "sync of %s failed: %s",
-                                                  progress.destUrl.c_str(), errorText(-synced)));
+                                       posixError({replaceFunction, __LINE__}, synced, "sync of %s failed: %s",
+                                                  progress.destUrl.c_str(), synced.text()));
     progress.newRecord->setDurable(true);
     return {};
 }
@@ -93,15 +93,14 @@ Result<void> Replace::move(const ReplaceRequest& request, Progress& progress, St
     if (result && progress.newMovesLater) {
         const platform::BlockingScope blocking;
         // A cut could leave the second of two moves without the first, with nothing else to keep their order.
-        const int ordered =
+        const Errno ordered =
             needs_.moves.durability().between(progress.prepared.waiting.get(), progress.directories.dest.get());
         askHome();
         const AllIdentifiersWriteLock lock(needs_.locks);
         result = recoveringFromExceptions(progress, [&]() -> Result<void> {
-            if (ordered < 0)
-                return undoFirstMove(progress,
-                                     posixError({replaceFunction, __LINE__}, -ordered, "sync of %s failed: %s",
-                                                progress.waitingUrl.c_str(), errorText(-ordered)));
+            if (ordered)
+                return undoFirstMove(progress, posixError({replaceFunction, __LINE__}, ordered, "sync of %s failed: %s",
+                                                          progress.waitingUrl.c_str(), ordered.text()));
             return putNewInPlace(request, progress);
         });
     }
@@ -144,7 +143,7 @@ Result<void> Replace::begin(const ReplaceRequest& request, Progress& progress, c
 }
 
 ZORError Replace::changedTooOften(const Progress& progress) {
-    const ZORError cause = posixError({replaceFunction, __LINE__}, EBUSY,
+    const ZORError cause = posixError({replaceFunction, __LINE__}, Errno(EBUSY),
                                       "the containers changed whenever they had been prepared; try again");
     return progress.oldRecord ? oldNotMoved(progress, cause) : notInPlace(progress, cause);
 }

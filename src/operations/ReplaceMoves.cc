@@ -97,11 +97,10 @@ Result<void> Replace::forgetOld(const ReplaceRequest& request, const Progress& p
 Result<void> Replace::judgeMoved(int directory, const FileURL& url, const FileDescriptor& moved) {
     struct stat named{};
     struct stat meant{};
-    const int failure = fs::statusOfName(directory, std::string(url.lastPathComponent()).c_str(), named);
-    if (failure == 0 && ::fstat(moved.get(), &meant) == 0 && named.st_dev == meant.st_dev &&
-        named.st_ino == meant.st_ino)
+    const Errno failure = fs::statusOfName(directory, std::string(url.lastPathComponent()).c_str(), named);
+    if (!failure && ::fstat(moved.get(), &meant) == 0 && named.st_dev == meant.st_dev && named.st_ino == meant.st_ino)
         return {};
-    return posixError({replaceFunction, __LINE__}, failure != 0 ? failure : ESTALE,
+    return posixError({replaceFunction, __LINE__}, failure ? failure : Errno(ESTALE),
                       "what came to %s is not the container", url.c_str());
 }
 
@@ -112,12 +111,12 @@ Result<bool> Replace::changePlaces(Progress& progress) {
             directories.old.get(), std::string(progress.oldUrl.lastPathComponent()).c_str(), directories.fresh.get(),
             std::string(progress.newUrl.lastPathComponent()).c_str(), RENAME_EXCHANGE);
     };
-    const int exchanged = exchange();
-    if (exchanged == -EXDEV || exchanged == -EINVAL || exchanged == -ENOSYS || exchanged == -EOPNOTSUPP)
+    const Errno exchanged = exchange();
+    if (exchanged == EXDEV || exchanged == EINVAL || exchanged == ENOSYS || exchanged == EOPNOTSUPP)
         return false;
-    if (exchanged < 0)
-        return posixError({replaceFunction, __LINE__}, -exchanged, "exchange of %s and %s failed: %s",
-                          progress.oldUrl.c_str(), progress.newUrl.c_str(), errorText(-exchanged));
+    if (exchanged)
+        return posixError({replaceFunction, __LINE__}, exchanged, "exchange of %s and %s failed: %s",
+                          progress.oldUrl.c_str(), progress.newUrl.c_str(), exchanged.text());
     for (const auto& [directory, url, one] : {std::tuple(&directories.old, &progress.oldUrl, &progress.newOne),
                                               std::tuple(&directories.fresh, &progress.newUrl, &progress.oldOne)})
         if (auto meant = judgeMoved(directory->get(), *url, *one); !meant) {
@@ -205,7 +204,7 @@ Result<void> Replace::moveNew(Progress& progress) {
             return needs_.fileManager.renameItem(directories.fresh.get(), progress.newUrl, directories.dest.get(),
                                                  progress.destUrl);
         if (!isSameNew(progress))
-            return posixError({replaceFunction, __LINE__}, ESTALE, "%s is not what was copied",
+            return posixError({replaceFunction, __LINE__}, Errno(ESTALE), "%s is not what was copied",
                               progress.newUrl.c_str());
         TRY(needs_.fileManager.renameItem(prepared.copies.get(), prepared.copyUrl, directories.dest.get(),
                                           progress.destUrl));
@@ -287,10 +286,11 @@ std::optional<ZORError> Replace::cleanUpReplace(Progress& progress, StartDeletio
     }
     // The moves are on the disk before the journal can be gone. If that cannot be, the journal stays for the next
     // request or launch, which finds what has moved.
-    const int ordered = progress.moved ? needs_.moves.durability().between(progress.moved->get(), journals.get()) : 0;
-    if (ordered < 0)
-        return journalStays(posixError({replaceFunction, __LINE__}, -ordered, "sync of %s failed: %s",
-                                       progress.destUrl.deletingLastPathComponent().c_str(), errorText(-ordered)));
+    const Errno ordered =
+        progress.moved ? needs_.moves.durability().between(progress.moved->get(), journals.get()) : Errno();
+    if (ordered)
+        return journalStays(posixError({replaceFunction, __LINE__}, ordered, "sync of %s failed: %s",
+                                       progress.destUrl.deletingLastPathComponent().c_str(), ordered.text()));
     std::optional<ZORError> failed;
     if (const auto moved = needs_.deathRow._moveItemAtURLToDeathRow(progress.waitingUrl, StartDeletionThread::no);
         !moved)
@@ -298,7 +298,7 @@ std::optional<ZORError> Replace::cleanUpReplace(Progress& progress, StartDeletio
                            LogFlag::yes, "Failed to remove staging dir: %s", progress.waitingUrl.c_str());
     const std::string journalName(journalUrl.lastPathComponent());
     if (const auto moved = needs_.deathRow._moveItemAtURLToDeathRow(journalUrl, startDeletionThread);
-        !moved && needs_.fileManager.disk().unlinkFile(journals.get(), journalName.c_str()) < 0)
+        !moved && needs_.fileManager.disk().unlinkFile(journals.get(), journalName.c_str()))
         failed = journalStays(moved.error());
     return failed;
 }

@@ -131,12 +131,12 @@ Result<FileURL> Replace::openWaitingPlace(FileDescriptor& directory, const FileU
     if (!aside)
         return posixError({replaceFunction, __LINE__}, aside.error(),
                           "there is no place on the file system of %s for a container that is replaced: %s",
-                          beside.c_str(), errorText(aside.error()));
+                          beside.c_str(), aside.error().text());
     directory = std::move(*aside);
     // A cut could keep a move into it and lose the directory, if it was just made, where nothing keeps the order.
-    if (const int synced = needs_.moves.durability().beforeRemoval(directory.get()); synced < 0)
-        return posixError({replaceFunction, __LINE__}, -synced, "sync of %s failed: %s",
-                          fs::asideBelow(top->url).c_str(), errorText(-synced));
+    if (const Errno synced = needs_.moves.durability().beforeRemoval(directory.get()))
+        return posixError({replaceFunction, __LINE__}, synced, "sync of %s failed: %s",
+                          fs::asideBelow(top->url).c_str(), synced.text());
     return fs::asideBelow(top->url);
 }
 

@@ -71,10 +71,10 @@ Found lookAside(ZORFileManager& fileManager, const ReplaceJournal& journal) {
         return look(fileManager, journal.stagingUrl);
     const auto aside = fs::openAsideOf(fileManager.resolver(), journal.asideUrl);
     struct stat status{};
-    const int failure =
+    const Errno failure =
         aside ? fs::statusOfName(aside->get(), std::string(journal.asideUrl.lastPathComponent()).c_str(), status)
-              : EAGAIN;
-    return failure == 0 ? Found::present : failure == ENOENT ? Found::absent : Found::unknown;
+              : Errno(EAGAIN);
+    return !failure ? Found::present : failure == ENOENT ? Found::absent : Found::unknown;
 }
 
 /// nullptr when what matters cannot be examined.
@@ -204,7 +204,7 @@ Result<void> ReplaceRecovery::applyReplaceJournal(const ReplaceJournal& journal)
             const FileURL place = journal.oldUrl.deletingLastPathComponent();
             const auto owner = needs_.configuration.ownerOfClassDirectory(place);
             if (!owner)
-                return posixError({recoverFunction, __LINE__}, EINVAL, "%s holds no containers", place.c_str());
+                return posixError({recoverFunction, __LINE__}, Errno(EINVAL), "%s holds no containers", place.c_str());
             const FileURL& waiting = journal.waitingUrl();
             fs::OpenResult aside = fs::openAsideOf(fileManager.resolver(), waiting);
             const auto from =
@@ -221,7 +221,7 @@ Result<void> ReplaceRecovery::applyReplaceJournal(const ReplaceJournal& journal)
     if (!state->settled)
         return {};
     const FileURL place = (journal.*state->settled).deletingLastPathComponent();
-    if (needs_.moves.orderBetween(place, needs_.configuration.replaceDirectory()) < 0)
+    if (needs_.moves.orderBetween(place, needs_.configuration.replaceDirectory()))
         return failed(nullptr);
     return {};
 }

@@ -47,7 +47,7 @@ bool ReplaceRecovery::mayComeBack(const FileURL& staged, const WaitingReplaces::
         });
     }
     struct stat status{};
-    if (resolver.status(staged, status) != 0)
+    if (resolver.status(staged, status))
         return true;
     const std::uint32_t owner = layoutOf(atStake.containerClass, atStake.userId).topLevelOwner;
     return ::geteuid() != 0 || status.st_uid == (owner == ownerUnchanged ? ::geteuid() : owner);
@@ -57,7 +57,7 @@ Result<void> ReplaceRecovery::refuseIfUnderWay(std::uint32_t userId, ContainerCl
                                                std::string_view identifier) const {
     if (!waiting_.isUnderWay(userId, containerClass, identifier))
         return {};
-    return posixError(ZOR_HERE, EINPROGRESS, "a replace of %s is under way", ZOR_SHOWN(std::string(identifier)));
+    return posixError(ZOR_HERE, Errno(EINPROGRESS), "a replace of %s is under way", ZOR_SHOWN(std::string(identifier)));
 }
 
 Result<bool> ReplaceRecovery::settleReplaces(const ContainerAtStake& atStake, const AllIdentifiersWriteLock& /*held*/) {

@@ -64,7 +64,7 @@ ZORApplicationTerminationAssertion::initWithBundleIdentifier(const Log& log,
                                                              const std::string& bundleIdentifier, std::uint8_t reason) {
     const auto acquisition = std::make_shared<Acquisition>();
     if (!acquisition->usable()) {
-        log.write(logLevelError, initFunction, "Failed to create completion semaphore: %s", errorText(errno));
+        log.write(logLevelError, initFunction, "Failed to create completion semaphore: %s", Errno::last().text());
         return nullptr;
     }
     Handle handle = service.acquire(bundleIdentifier, reasonOf(log, reason),

@@ -66,10 +66,9 @@ ZORContainerMigrator::Outcome ZORContainerMigrator::performMigrationWithError() 
         bundles, needs_.configuration.users().installer, needs_.configuration.users().installer,
         needs_.configuration.users().first, needs_.report.check());
     if (owned)
-        if (const int failure = needs_.moves.orderBetween(bundles, needs_.configuration.libraryDirectory());
-            failure < 0)
-            owned = posixError({migrationFunction, __LINE__}, -failure, "sync of %s failed: %s", bundles.c_str(),
-                               errorText(-failure));
+        if (const Errno failure = needs_.moves.orderBetween(bundles, needs_.configuration.libraryDirectory()))
+            owned = posixError({migrationFunction, __LINE__}, failure, "sync of %s failed: %s", bundles.c_str(),
+                               failure.text());
     if (!owned)
         return {.succeeded = false,
                 .error = makeError(log, {migrationFunction, __LINE__}, ErrorCode::ownerNotChanged, &owned.error(),
@@ -96,10 +95,10 @@ std::optional<ZORError> ZORContainerMigrator::cannotLook(const FileURL& former) 
         return std::nullopt;
     const auto hider = fs::hiddenBy(resolver, needs_.fileManager.disk(), former);
     if (hider)
-        return posixError({migrationFunction, __LINE__}, ENOKEY, "An encryption whose key is away hides what is in %s",
-                          hider->c_str());
+        return posixError({migrationFunction, __LINE__}, Errno(ENOKEY),
+                          "An encryption whose key is away hides what is in %s", hider->c_str());
     if (needs_.configuration.homeOf(needs_.configuration.users().first)->look().state == UserHome::State::missing)
-        return posixError({migrationFunction, __LINE__}, ENOENT, "The home of user %u is not there",
+        return posixError({migrationFunction, __LINE__}, Errno(ENOENT), "The home of user %u is not there",
                           needs_.configuration.users().first);
     return std::nullopt;
 }
@@ -116,7 +115,7 @@ bool ZORContainerMigrator::mayHoldBundles(const FileURL& former) {
     // A directory that cannot be examined counts as there: its move fails, no marker is written, and the next boot
     // tries again. A link on the way is the doing of the user who owned the place, and would keep failing.
     struct stat status{};
-    const int failure = needs_.fileManager.resolver().status(former, status);
+    const Errno failure = needs_.fileManager.resolver().status(former, status);
     return failure != ENOENT && failure != ELOOP && failure != ENOTDIR;
 }
 
@@ -164,7 +163,7 @@ Result<void> ZORContainerMigrator::moveEachFormerBundle(const FileURL& former) {
                                                                               containerClass, false);
         for (const FileURL& container : *containers)
             if (!needs_.report.goOn())
-                return posixError({migrationFunction, __LINE__}, ECANCELED, "The daemon was told to end");
+                return posixError({migrationFunction, __LINE__}, Errno(ECANCELED), "The daemon was told to end");
             else if (isOfAnother(container))
                 continue;
             else if (auto moved =
@@ -193,7 +192,7 @@ Result<void> ZORContainerMigrator::moveFormerBundle(const FileURL& container, co
     const auto from = fileManager.resolver().openParent(container);
     if (!from)
         return posixError({migrationFunction, __LINE__}, from.error(), "rename of %s to %s failed: %s",
-                          container.c_str(), target.c_str(), errorText(from.error()));
+                          container.c_str(), target.c_str(), from.error().text());
     // The old owner's until the end of a migration that was cut short.
     auto to = fileManager.openDirectoryOf(needs_.configuration.users().first, place);
     if (!to)

@@ -181,7 +181,7 @@ Result<platform::FileDescriptor> ZORDataProtectionChangeOperation::openContainer
     if (!opened || ::fstat(opened->get(), &status) != 0) {
         const Errno error = platform::neverLocked(opened ? Errno::last() : opened.error());
         return posixError({passFunction, __LINE__}, error, "fts_open failed for %s : %s", shown(items).c_str(),
-                          errorText(error));
+                          error.text());
     }
     // While the change waited, another one may have come to the same place.
     const auto identity = identityOf(opened->get());
@@ -199,7 +199,7 @@ Result<void> ZORDataProtectionChangeOperation::walk(int container, const std::ve
     std::optional<ZORError> failure;
     for (const Item& item : items) {
         fs::TreeWalker walker(fs::WalkStatus::typeOnly);
-        const int status = walker.walk(container, item.name.c_str(), [&](const WalkEntry& entry) {
+        const Errno status = walker.walk(container, item.name.c_str(), [&](const WalkEntry& entry) {
             if (auto visited = visit(entry, item); !visited) {
                 failure = std::move(visited).error();
                 return WalkStep::stop;
@@ -208,9 +208,9 @@ Result<void> ZORDataProtectionChangeOperation::walk(int container, const std::ve
         });
         if (failure)
             return *failure;
-        if (status < 0)
+        if (status)
             needs_.log.write(logLevelError, passFunction, "FTS returned error for %s : %s", item.path.c_str(),
-                             errorText(-status));
+                             status.text());
     }
     saySharedFiles();
     return {};
@@ -243,7 +243,7 @@ Result<void> ZORDataProtectionChangeOperation::visit(const WalkEntry& entry, con
         break;
     }
     needs_.log.write(logLevelError, passFunction, "FTS returned error for %s : %s", ZOR_SHOWN(path()),
-                     errorText(entry.error));
+                     entry.error.text());
     return {};
 }
 

@@ -11,7 +11,7 @@
 
 namespace zor::platform {
 
-/// Watches an open directory, wherever its name points by now. The watch's number, or an errno.
+/// Watches an open directory, wherever its name points by now. The watch's number.
 [[nodiscard]] ErrnoOr<int> watchDirectory(int inotify, int directory, std::uint32_t events);
 
 /// Takes all pending events of a non-blocking inotify descriptor. True when `counts` accepted one of them.

@@ -2,6 +2,7 @@
 #include "os/LinuxDisk.h"
 
 #include "base/BlockingScope.h"
+#include "base/Try.h"
 #include "os/Openat2.h"
 
 #include <cerrno>
@@ -25,140 +26,148 @@ constexpr long fchmodat2Number = 452;
 constexpr long fchmodat2Number = SYS_fchmodat2;
 #endif
 
-/// The call's result, or the negative errno; a call that a signal interrupted is made again.
+/// A call that a signal interrupted is made again.
 template <typename Call>
-auto checked(Call call) -> decltype(call()) {
+auto resultOf(Call call) -> ErrnoOr<decltype(call())> {
     for (;;) {
         const auto result = call();
         if (result >= 0)
             return result;
         if (errno != EINTR)
-            return -errno;
+            return Errno::last();
     }
+}
+
+template <typename Call>
+Errno made(Call call) {
+    (void)TRY(resultOf(call));
+    return Errno();
 }
 
 } // namespace
 
 LinuxDisk::LinuxDisk(Syncs syncs) : syncs_(syncs), ownershipCanChange_(::geteuid() == 0) {}
 
-int LinuxDisk::makeDirectory(int directory, const char* name, mode_t mode) {
-    return checked([&] { return ::mkdirat(directory, name, mode); });
+Errno LinuxDisk::makeDirectory(int directory, const char* name, mode_t mode) {
+    return made([&] { return ::mkdirat(directory, name, mode); });
 }
 
-int LinuxDisk::createFile(int directory, const char* name, mode_t mode) {
-    return checked([&] { return ::openat(directory, name, O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode); });
+ErrnoOr<FileDescriptor> LinuxDisk::createFile(int directory, const char* name, mode_t mode) {
+    constexpr int flags = O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC;
+    return FileDescriptor(TRY(resultOf([&] { return ::openat(directory, name, flags, mode); })));
 }
 
-int LinuxDisk::makeSymbolicLink(const char* target, int directory, const char* name) {
-    return checked([&] { return ::symlinkat(target, directory, name); });
+Errno LinuxDisk::makeSymbolicLink(const char* target, int directory, const char* name) {
+    return made([&] { return ::symlinkat(target, directory, name); });
 }
 
-int LinuxDisk::makeHardLink(int fromDirectory, const char* from, int toDirectory, const char* to) {
-    return checked([&] { return ::linkat(fromDirectory, from, toDirectory, to, 0); });
+Errno LinuxDisk::makeHardLink(int fromDirectory, const char* from, int toDirectory, const char* to) {
+    return made([&] { return ::linkat(fromDirectory, from, toDirectory, to, 0); });
 }
 
-int LinuxDisk::makeFifo(int directory, const char* name, mode_t mode) {
-    return checked([&] { return ::mkfifoat(directory, name, mode); });
+Errno LinuxDisk::makeFifo(int directory, const char* name, mode_t mode) {
+    return made([&] { return ::mkfifoat(directory, name, mode); });
 }
 
-int LinuxDisk::rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) {
-    return checked([&] { return ::renameat2(fromDirectory, from, toDirectory, to, flags); });
+Errno LinuxDisk::rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) {
+    return made([&] { return ::renameat2(fromDirectory, from, toDirectory, to, flags); });
 }
 
-int LinuxDisk::unlinkFile(int directory, const char* name) {
-    return checked([&] { return ::unlinkat(directory, name, 0); });
+Errno LinuxDisk::unlinkFile(int directory, const char* name) {
+    return made([&] { return ::unlinkat(directory, name, 0); });
 }
 
-int LinuxDisk::removeDirectory(int directory, const char* name) {
-    return checked([&] { return ::unlinkat(directory, name, AT_REMOVEDIR); });
+Errno LinuxDisk::removeDirectory(int directory, const char* name) {
+    return made([&] { return ::unlinkat(directory, name, AT_REMOVEDIR); });
 }
 
-int LinuxDisk::changeMode(int fd, mode_t mode) {
-    int result = checked([&] { return ::fchmod(fd, mode); });
-    if (result != -EBADF)
-        return result;
+Errno LinuxDisk::changeMode(int fd, mode_t mode) {
+    Errno error = made([&] { return ::fchmod(fd, mode); });
+    if (error != EBADF)
+        return error;
     // An O_PATH descriptor. Kernels before 6.6 lack the call, and some sandboxes answer EPERM for a call unknown to
     // them.
-    result = checked([&] { return static_cast<int>(::syscall(fchmodat2Number, fd, "", mode, AT_EMPTY_PATH)); });
-    if (result != -ENOSYS && result != -EPERM)
-        return result;
+    error = made([&] { return ::syscall(fchmodat2Number, fd, "", mode, AT_EMPTY_PATH); });
+    if (error != ENOSYS && error != EPERM)
+        return error;
     char path[32];
     std::snprintf(path, sizeof path, "/proc/self/fd/%d", fd);
-    return checked([&] { return ::chmod(path, mode); });
+    return made([&] { return ::chmod(path, mode); });
 }
 
-int LinuxDisk::changeOwner(int fd, uid_t uid, gid_t gid) {
+Errno LinuxDisk::changeOwner(int fd, uid_t uid, gid_t gid) {
     if (!ownershipCanChange_)
-        return 0;
-    return checked([&] { return ::fchownat(fd, "", uid, gid, AT_EMPTY_PATH | AT_SYMLINK_NOFOLLOW); });
+        return Errno();
+    return made([&] { return ::fchownat(fd, "", uid, gid, AT_EMPTY_PATH | AT_SYMLINK_NOFOLLOW); });
 }
 
-int LinuxDisk::changeOwnerOf(int directory, const char* name, uid_t uid, gid_t gid) {
+Errno LinuxDisk::changeOwnerOf(int directory, const char* name, uid_t uid, gid_t gid) {
     if (!ownershipCanChange_)
-        return 0;
-    return checked([&] { return ::fchownat(directory, name, uid, gid, AT_SYMLINK_NOFOLLOW); });
+        return Errno();
+    return made([&] { return ::fchownat(directory, name, uid, gid, AT_SYMLINK_NOFOLLOW); });
 }
 
-int LinuxDisk::setTimes(int fd, const timespec& access, const timespec& modification) {
+Errno LinuxDisk::setTimes(int fd, const timespec& access, const timespec& modification) {
     const timespec times[2] = {access, modification};
-    return checked([&] { return ::utimensat(fd, "", times, AT_EMPTY_PATH); });
+    return made([&] { return ::utimensat(fd, "", times, AT_EMPTY_PATH); });
 }
 
-int LinuxDisk::setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) {
-    const int set = checked([&] { return ::fsetxattr(fd, name, value.data(), value.size(), 0); });
+Errno LinuxDisk::setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) {
+    const Errno error = made([&] { return ::fsetxattr(fd, name, value.data(), value.size(), 0); });
+    if (error != EBADF || fd < 0)
+        return error;
     // One that was opened for its path alone is reached by the kernel's link to it.
-    const std::string link = set == -EBADF && fd >= 0 ? "/proc/self/fd/" + std::to_string(fd) : "";
-    return link.empty() ? set : checked([&] { return ::setxattr(link.c_str(), name, value.data(), value.size(), 0); });
+    const std::string link = "/proc/self/fd/" + std::to_string(fd);
+    return made([&] { return ::setxattr(link.c_str(), name, value.data(), value.size(), 0); });
 }
 
-int LinuxDisk::setInodeFlags(int fd, int flags) {
-    return checked([&] { return ::ioctl(fd, FS_IOC_SETFLAGS, &flags); });
+Errno LinuxDisk::setInodeFlags(int fd, int flags) {
+    return made([&] { return ::ioctl(fd, FS_IOC_SETFLAGS, &flags); });
 }
 
-int LinuxDisk::write(int fd, std::span<const std::uint8_t> bytes) {
+Errno LinuxDisk::write(int fd, std::span<const std::uint8_t> bytes) {
     while (!bytes.empty()) {
-        const ssize_t written = checked([&] { return ::write(fd, bytes.data(), bytes.size()); });
-        if (written < 0)
-            return static_cast<int>(written);
+        const ssize_t written = TRY(resultOf([&] { return ::write(fd, bytes.data(), bytes.size()); }));
         if (written == 0)
-            return -EIO;
+            return Errno(EIO);
         bytes = bytes.subspan(static_cast<std::size_t>(written));
     }
-    return 0;
+    return Errno();
 }
 
-int LinuxDisk::cloneData(int from, int to) {
-    return checked([&] { return ::ioctl(to, FICLONE, from); });
+Errno LinuxDisk::cloneData(int from, int to) {
+    return made([&] { return ::ioctl(to, FICLONE, from); });
 }
 
-ssize_t LinuxDisk::copyData(int from, int to, std::size_t bytesMax) {
-    return checked([&] { return ::copy_file_range(from, nullptr, to, nullptr, bytesMax, 0); });
+ErrnoOr<std::size_t> LinuxDisk::copyData(int from, int to, std::size_t bytesMax) {
+    return static_cast<std::size_t>(
+        TRY(resultOf([&] { return ::copy_file_range(from, nullptr, to, nullptr, bytesMax, 0); })));
 }
 
-int LinuxDisk::sync(int fd) {
+Errno LinuxDisk::sync(int fd) {
     if (syncs_ == Syncs::off)
-        return 0;
+        return Errno();
     const BlockingScope scope;
-    return checked([&] { return ::fsync(fd); });
+    return made([&] { return ::fsync(fd); });
 }
 
-int LinuxDisk::syncFileSystem(int fd) {
+Errno LinuxDisk::syncFileSystem(int fd) {
     if (syncs_ == Syncs::off)
-        return 0;
+        return Errno();
     const BlockingScope scope;
-    return checked([&] { return ::syncfs(fd); });
+    return made([&] { return ::syncfs(fd); });
 }
 
-int LinuxDisk::orderData(int fd) {
+Errno LinuxDisk::orderData(int fd) {
     if (syncs_ == Syncs::off)
-        return 0;
+        return Errno();
     const BlockingScope scope;
     constexpr unsigned whole = SYNC_FILE_RANGE_WAIT_BEFORE | SYNC_FILE_RANGE_WRITE | SYNC_FILE_RANGE_WAIT_AFTER;
-    const int result = checked([&] { return ::sync_file_range(fd, 0, 0, whole); });
-    return result == -ENOSYS ? checked([&] { return ::fdatasync(fd); }) : result;
+    const Errno error = made([&] { return ::sync_file_range(fd, 0, 0, whole); });
+    return error == ENOSYS ? made([&] { return ::fdatasync(fd); }) : error;
 }
 
-ssize_t LinuxDisk::read(int fd, std::span<std::uint8_t> bytes) {
+ErrnoOr<std::size_t> LinuxDisk::read(int fd, std::span<std::uint8_t> bytes) {
     return readOnce(fd, bytes);
 }
 

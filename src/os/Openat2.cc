@@ -150,11 +150,13 @@ ErrnoOr<std::vector<std::string>> directoryNames(int directory) {
     return names;
 }
 
-ssize_t readOnce(int fd, std::span<std::uint8_t> bytes) {
+ErrnoOr<std::size_t> readOnce(int fd, std::span<std::uint8_t> bytes) {
     for (;;) {
         const ssize_t count = ::read(fd, bytes.data(), bytes.size());
-        if (count >= 0 || errno != EINTR)
-            return count >= 0 ? count : -errno;
+        if (count >= 0)
+            return static_cast<std::size_t>(count);
+        if (errno != EINTR)
+            return Errno::last();
     }
 }
 

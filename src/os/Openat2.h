@@ -44,8 +44,8 @@ namespace zor::platform {
 /// Everything from the descriptor's offset on. EFBIG when that is more than `bytesMax`, EINVAL when it is no regular
 /// file.
 [[nodiscard]] ErrnoOr<std::string> readSmallFile(int fd, std::size_t bytesMax);
-/// read(2) that no signal ends: the count, or the negative errno.
-[[nodiscard]] ssize_t readOnce(int fd, std::span<std::uint8_t> bytes);
+/// read(2) that no signal ends: the count.
+[[nodiscard]] ErrnoOr<std::size_t> readOnce(int fd, std::span<std::uint8_t> bytes);
 
 // The names in a directory that only root writes to. Any thread.
 

@@ -55,7 +55,7 @@ void RotatingLog::enableDiskLogging(const std::string& path, unsigned fileCount,
     openAgainAt_ = 0;
     directory_.reset(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
     if (!directory_.valid())
-        error_ = errno;
+        error_ = Errno::last();
     else
         openFile();
     if (!file_.valid())
@@ -63,7 +63,7 @@ void RotatingLog::enableDiskLogging(const std::string& path, unsigned fileCount,
 }
 
 void RotatingLog::sayNoFile(const std::string& path) const {
-    const std::string text = formatted("Failed to open the log file %s: %s", path.c_str(), ::strerrordesc_np(error_));
+    const std::string text = formatted("Failed to open the log file %s: %s", path.c_str(), error_.text());
     if (!writeToJournal(LOG_ERR, "log", text))
         ::syslog(LOG_DAEMON | LOG_ERR, "%s", text.c_str());
 }
@@ -118,11 +118,11 @@ void RotatingLog::openFile() {
     FileDescriptor file(::openat(directory_.get(), baseName_.c_str(), flags, fileMode));
     struct stat status{};
     if (!file.valid() || ::fstat(file.get(), &status) != 0) {
-        error_ = errno;
+        error_ = Errno::last();
         return;
     }
     if (!S_ISREG(status.st_mode)) {
-        error_ = EINVAL;
+        error_ = Errno(EINVAL);
         return;
     }
     file_ = std::move(file);
@@ -134,14 +134,14 @@ void RotatingLog::rotate() {
         if (::ftruncate(file_.get(), 0) == 0)
             fileBytes_ = 0;
         else
-            error_ = errno;
+            error_ = Errno::last();
         return;
     }
     for (unsigned index = fileCount_ - 1; index > 0; --index) {
         const std::string from = fileName(index - 1);
         const std::string to = fileName(index);
         if (::renameat(directory_.get(), from.c_str(), directory_.get(), to.c_str()) != 0 && errno != ENOENT) {
-            error_ = errno;
+            error_ = Errno::last();
             return;
         }
     }
@@ -157,7 +157,7 @@ void RotatingLog::writeToFile(const std::string& line) {
     if (lostUnsaid_ > 0) {
         if (!append(format(LOG_ERR, "log",
                            formatted("%llu log lines were lost: %s", static_cast<unsigned long long>(lostUnsaid_),
-                                     ::strerrordesc_np(error_))))) {
+                                     error_.text())))) {
             lose();
             return;
         }
@@ -180,7 +180,7 @@ bool RotatingLog::append(const std::string& line) {
         }
         if (written < 0 && errno == EINTR)
             continue;
-        error_ = written < 0 ? errno : ENOSPC;
+        error_ = written < 0 ? Errno::last() : Errno(ENOSPC);
         // Half a line would be glued to the next one.
         if (written > 0 && ::ftruncate(file_.get(), static_cast<off_t>(fileBytes_)) != 0)
             fileBytes_ += static_cast<std::size_t>(written);

@@ -15,6 +15,7 @@
 #include "base/Mutex.h"
 #include "os/FileDescriptor.h"
 #include "os/ServiceManager.h"
+#include "platform/Errno.h"
 #include "platform/PlatformLog.h"
 
 #include <atomic>
@@ -78,7 +79,7 @@ private:
     std::size_t fileBytes_ ZOR_GUARDED_BY(mutex_) = 0;
     /// Lines lost since the last one that was written, and the errno of the last loss.
     std::uint64_t lostUnsaid_ ZOR_GUARDED_BY(mutex_) = 0;
-    int error_ ZOR_GUARDED_BY(mutex_) = 0;
+    Errno error_ ZOR_GUARDED_BY(mutex_);
     /// When a file that could not be opened is tried again, in seconds of the monotonic clock.
     std::int64_t openAgainAt_ ZOR_GUARDED_BY(mutex_) = 0;
     /// The reader of standard error has stopped reading; lines are left out there until it goes on.

@@ -24,15 +24,13 @@ constexpr mode_t runtimeMode = 0755;
 
 /// Makes the directory unless it is there, and opens it.
 ErrnoOr<FileDescriptor> makeAndOpen(Disk& disk, int parent, const char* name) {
-    const int made = disk.makeDirectory(parent, name, runtimeMode);
-    if (made < 0 && made != -EEXIST)
-        return Errno(-made);
-    auto opened = openBeneath(parent, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
-    if (opened && made == 0) {
-        // The process's umask does not decide who can reach the sockets.
-        if (const int changed = disk.changeMode(opened->get(), runtimeMode); changed < 0)
-            return Errno(-changed);
-    }
+    const Errno made = disk.makeDirectory(parent, name, runtimeMode);
+    if (made && made != EEXIST)
+        return made;
+    FileDescriptor opened = TRY(openBeneath(parent, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW));
+    // The process's umask does not decide who can reach the sockets.
+    if (!made)
+        TRY(disk.changeMode(opened.get(), runtimeMode));
     return opened;
 }
 

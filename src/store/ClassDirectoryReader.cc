@@ -28,7 +28,7 @@ public:
         const platform::MutexLock held(mutex_);
         ++count_;
         if (cause && cause->isOwnShortage())
-            shortage_ = cause->code();
+            shortage_ = Errno(cause->code());
         isHidden_ = isHidden_ || (cause && cause->isPosix(ENOKEY));
         first_.emplace(index, std::move(error));
         if (first_.size() > refusalsSaidMax)
@@ -43,8 +43,8 @@ public:
             log.write(logLevelError, "readAndValidateMetadataAtUrl", "%llu more entries of %s are no containers",
                       static_cast<unsigned long long>(count_ - first_.size()), directory.c_str());
     }
-    /// The errno when this process was short of descriptors or memory.
-    [[nodiscard]] std::optional<int> shortage() {
+    /// That this process was short of descriptors or memory.
+    Errno shortage() {
         const platform::MutexLock held(mutex_);
         return shortage_;
     }
@@ -57,7 +57,7 @@ private:
     platform::Mutex mutex_;
     std::uint64_t count_ ZOR_GUARDED_BY(mutex_) = 0;
     std::map<std::size_t, ZORError> first_ ZOR_GUARDED_BY(mutex_);
-    std::optional<int> shortage_ ZOR_GUARDED_BY(mutex_);
+    Errno shortage_ ZOR_GUARDED_BY(mutex_);
     bool isHidden_ ZOR_GUARDED_BY(mutex_) = false;
 };
 
@@ -75,9 +75,9 @@ struct Names {
 } // namespace
 
 Result<void> ClassDirectoryReader::forEach(const std::function<void(std::shared_ptr<ZORMetadata>)>& found) {
-    const auto failed = [&](int number) {
-        return posixError({"urlsForItemsInDirectoryAtURL", __LINE__}, number, "_IterateDirectory for %s returned %s",
-                          directory_.c_str(), errorText(number));
+    const auto failed = [&](Errno error) {
+        return posixError({"urlsForItemsInDirectoryAtURL", __LINE__}, error, "_IterateDirectory for %s returned %s",
+                          directory_.c_str(), error.text());
     };
     const auto directory = fileManager_.resolver().openDirectory(directory_);
     platform::Disk& disk = fileManager_.disk();
@@ -85,11 +85,11 @@ Result<void> ClassDirectoryReader::forEach(const std::function<void(std::shared_
                             ? disk.hidesNames(directory->get())
                             : directory.error() == ENOENT && fs::hiddenBy(fileManager_.resolver(), disk, directory_);
     if (!directory || hidden) {
-        const int number = hidden ? ENOKEY : directory.error().number();
-        if (number != ENOENT)
+        const Errno error = hidden ? Errno(ENOKEY) : directory.error();
+        if (error != ENOENT)
             log_.write(logLevelError, "_IterateDirectory", "opendir of %s failed: %s", directory_.c_str(),
-                       errorText(number));
-        return failed(number);
+                       error.text());
+        return failed(error);
     }
     Names names;
     fs::BulkDirectoryRead::Buffer buffer;
@@ -97,7 +97,7 @@ Result<void> ClassDirectoryReader::forEach(const std::function<void(std::shared_
     while (const auto* entry = entries.next())
         if (entry->name[0] != '.')
             names.add(entry->name, entry->nameBytes);
-    if (entries.error() != 0)
+    if (entries.error())
         return failed(entries.error());
 
     const MetadataReader reader(disk, directory->get(), std::make_shared<const std::string>(directory_.path()), userId_,
@@ -116,8 +116,8 @@ Result<void> ClassDirectoryReader::forEach(const std::function<void(std::shared_
     refusals.say(log_, directory_);
     metHidden_ = refusals.isHidden();
     // An entry that this process could not look at may be a container. Taken for none, it would get a double.
-    if (const auto shortage = refusals.shortage())
-        return failed(*shortage);
+    if (const Errno shortage = refusals.shortage())
+        return failed(shortage);
     for (auto& record : records)
         if (record)
             found(std::move(record));

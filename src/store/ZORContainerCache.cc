@@ -16,9 +16,6 @@ using platform::MutexLock;
 
 namespace {
 
-/// The look for a metadata file gives this for something else in its place; no errno.
-constexpr int isNoFile = -1;
-
 long number(ContainerClass containerClass) {
     return static_cast<long>(containerClass);
 }
@@ -102,35 +99,36 @@ Result<ZORContainerCache::Found> ZORContainerCache::findRecord(const Key& key, c
     return Found{.record = found->record, .place = found->record->place()};
 }
 
-int ZORContainerCache::lookForFile(const FileURL& container) {
+ErrnoOr<bool> ZORContainerCache::lookForFile(const FileURL& container) {
     if (container.empty())
-        return EINVAL;
+        return Errno(EINVAL);
     // A link or anything else in the file's place is no metadata file: the owner of the container can put it there.
     struct stat status{};
-    const int failure = fileManager_.resolver().status(container.appendingFile(names::metadataFile), status);
-    return failure != 0 || S_ISREG(status.st_mode) ? failure : isNoFile;
+    TRY(fileManager_.resolver().status(container.appendingFile(names::metadataFile), status));
+    return S_ISREG(status.st_mode);
 }
 
-Result<void> ZORContainerCache::checkOnDisk(Here here, const Key& key, const Found& found, int missing,
+Result<void> ZORContainerCache::checkOnDisk(Here here, const Key& key, const Found& found, const ErrnoOr<bool>& looked,
                                             const char* foundFormatPrefix) {
     if (found.place.empty())
         return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
                          "Cache: %s%s: nil URL from %s", className(key.containerClass), suffix(key.transient),
                          "(null)");
-    if (missing == 0) {
+    if (looked.value_or(false)) {
         traceIdentifier(here, key, foundFormatPrefix, found.record->identifier());
         return {};
     }
     const FileURL file = found.place.url().appendingFile(names::metadataFile);
-    if (missing != ENOENT && missing != isNoFile)
+    const Errno missing = looked ? Errno() : looked.error();
+    if (missing && missing != ENOENT)
         log_.write(logLevelError, "itemExistsAtURL", "Failed to determine if %s exists: %s", file.c_str(),
-                   errorText(missing));
+                   missing.text());
     if (missing == ENOENT && fs::hiddenBy(fileManager_.resolver(), fileManager_.disk(), file))
-        return failedToRebuild(here, key,
-                               posixError(here, ENOKEY, "An encryption whose key is away hides %s", file.c_str()));
+        return failedToRebuild(
+            here, key, posixError(here, Errno(ENOKEY), "An encryption whose key is away hides %s", file.c_str()));
     std::optional<ZORError> cause;
     if (isOwnShortage(missing))
-        cause = posixError(here, missing, "open of %s failed: %s", file.c_str(), errorText(missing));
+        cause = posixError(here, missing, "open of %s failed: %s", file.c_str(), missing.text());
     return makeError(log_, here, ErrorCode::cachedContainerWithoutMetadata, cause ? &*cause : nullptr, LogFlag::yes,
                      "Cache: %s%s: INCONSISTENT-No Metadata at: %s", className(key.containerClass),
                      suffix(key.transient), file.c_str());
@@ -175,7 +173,7 @@ std::optional<ZORContainerCache::LiveContainer> ZORContainerCache::liveContainer
         place = found->record->place();
     }
     const FileURL container = place.url();
-    if (lookForFile(container) != 0)
+    if (!lookForFile(container).value_or(false))
         return std::nullopt;
     traceIdentifier({"containerForUser", __LINE__}, key, "Found", identifier);
     live.path = container.path();
@@ -189,12 +187,12 @@ Result<ZORContainerCache::Record> ZORContainerCache::findOnDisk(Here here, const
         return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
                          "Cache: %s%s: Invalid URL path string: %s", className(key.containerClass),
                          suffix(key.transient), "(null)");
-    int missing = lookForFile(found.place.url());
-    if (missing == ENOENT && lookOver(key, found)) {
+    auto looked = lookForFile(found.place.url());
+    if (!looked && looked.error() == ENOENT && lookOver(key, found)) {
         found = TRY(findRecord(key, identifier));
-        missing = lookForFile(found.place.url());
+        looked = lookForFile(found.place.url());
     }
-    TRY(checkOnDisk(here, key, found, missing, "Found"));
+    TRY(checkOnDisk(here, key, found, looked, "Found"));
     return found.record;
 }
 
@@ -250,16 +248,16 @@ ZORContainerCache::allContainersForUser(std::uint32_t userId, ContainerClass con
 
 Result<std::vector<ZORContainerCache::Record>>
 ZORContainerCache::thoseOnDisk(Here here, const Key& key, std::vector<Found> found, std::uint64_t homeGeneration) {
-    std::vector<int> missing(found.size());
+    std::vector<ErrnoOr<bool>> looked(found.size(), false);
     fs::forEachStretch(found.size(), [&](std::size_t begin, std::size_t end) {
         for (std::size_t i = begin; i < end; ++i)
-            missing[i] = lookForFile(found[i].place.url());
+            looked[i] = lookForFile(found[i].place.url());
     });
     std::vector<Record> records;
     records.reserve(found.size());
     for (std::size_t i = 0; i < found.size(); ++i) {
         Found& one = found[i];
-        const auto there = checkOnDisk(here, key, one, missing[i], "ALL Found");
+        const auto there = checkOnDisk(here, key, one, looked[i], "ALL Found");
         if (!there && isLeftOpen(there.error(), key))
             return there.error();
         if (there)
@@ -269,7 +267,7 @@ ZORContainerCache::thoseOnDisk(Here here, const Key& key, std::vector<Found> fou
     UserHome* const home = records.size() == found.size() ? nullptr : homeOf(key);
     if (home && home->look().generation != homeGeneration)
         return failedToRebuild(here, key,
-                               posixError(here, ENOENT, "The home of user %u changed meanwhile", key.userId));
+                               posixError(here, Errno(ENOENT), "The home of user %u changed meanwhile", key.userId));
     return records;
 }
 

@@ -20,6 +20,7 @@
 #include "base/ZORError.h"
 #include "base/ZORException.h"
 #include "fs/Durability.h"
+#include "platform/Errno.h"
 #include "store/ZORGlobalConfiguration.h"
 #include "store/ZORMetadata.h"
 
@@ -153,8 +154,8 @@ private:
     template <typename Read>
     auto readUnlocked(const Key& key, Read&& read) ZOR_REQUIRES(cacheLock_);
     Result<ClassCache> readClassDirectory(const Key& key);
-    /// 0, or the errno for which the class has no directory now. One that is missing is not made for this.
-    int lookForDirectory(const Key& key);
+    /// The error for which the class has no directory now. One that is missing is not made for this.
+    Errno lookForDirectory(const Key& key);
     /// False when want of descriptors or memory left one unbuilt.
     bool buildAllOfUser(std::uint32_t userId) ZOR_EXCLUDES(cacheLock_);
     /// A record and where it lay when the cache was looked at. Another operation may move the container meanwhile; who
@@ -173,13 +174,14 @@ private:
     /// Whether the error says of the container neither that it is there nor that it is not.
     [[nodiscard]] bool isLeftOpen(const ZORError& error, const Key& key) const;
     ZORError failedToRebuild(Here here, const Key& key, const ZORError& cause);
-    /// 0 when the record's metadata file is there, an errno, or -1 when something else is there.
-    int lookForFile(const FileURL& container);
+    /// Whether what lies in the place of the record's metadata file is a file; an error when nothing does.
+    ErrnoOr<bool> lookForFile(const FileURL& container);
     /// Reads the class directory again for what has gone from its place; false when that was not to be, yet. True means
     /// that looking the record up again is worth while.
     bool lookOver(const Key& key, const Found& gone) ZOR_EXCLUDES(cacheLock_);
     /// Code 44 or 47 unless the look for the file found it; 43 where it is hidden.
-    Result<void> checkOnDisk(Here here, const Key& key, const Found& found, int missing, const char* foundFormatPrefix);
+    Result<void> checkOnDisk(Here here, const Key& key, const Found& found, const ErrnoOr<bool>& looked,
+                             const char* foundFormatPrefix);
     /// The containers that `take` chooses of a class's entries, under the cache's lock, and whose files are there.
     template <typename Take>
     Result<std::vector<Record>> listed(const Key& key, const Take& take);

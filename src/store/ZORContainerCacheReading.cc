@@ -84,11 +84,12 @@ Result<ZORContainerCache::ClassCache*> ZORContainerCache::_getCacheForUserId(con
         ClassCache& cache = caches_[key] = std::move(built);
         noteChange(cache);
         if (wanted == Wanted::whole && cache.hidesSome)
-            return posixError(ZOR_HERE, ENOKEY, "An encryption whose key is away hides containers of user %u, class %s",
-                              key.userId, className(key.containerClass));
+            return posixError(ZOR_HERE, Errno(ENOKEY),
+                              "An encryption whose key is away hides containers of user %u, class %s", key.userId,
+                              className(key.containerClass));
         return &cache;
     }
-    return posixError(ZOR_HERE, EAGAIN, "The containers of user %u, class %s, changed whenever they were read",
+    return posixError(ZOR_HERE, Errno(EAGAIN), "The containers of user %u, class %s, changed whenever they were read",
                       key.userId, className(key.containerClass));
 }
 
@@ -110,25 +111,25 @@ void ZORContainerCache::prepare(std::uint32_t userId, ContainerClass containerCl
 
 void ZORContainerCache::prepare(std::uint32_t userId, ContainerClass containerClass) {
     prepare(userId, containerClass, false);
-    if (isValidClass(containerClass) && lookForDirectory({userId, containerClass, true}) == 0)
+    if (isValidClass(containerClass) && !lookForDirectory({userId, containerClass, true}))
         prepare(userId, containerClass, true);
 }
 
-int ZORContainerCache::lookForDirectory(const Key& key) {
+Errno ZORContainerCache::lookForDirectory(const Key& key) {
     const auto place = configuration_.placeOfClass(key.userId, key.containerClass, key.transient);
     const auto directory = place ? fileManager_.resolver().openDirectory(*place) : Errno(ENOENT);
-    return directory ? 0 : directory.error().number();
+    return directory ? Errno() : directory.error();
 }
 
 Result<ZORContainerCache::ClassCache> ZORContainerCache::readClassDirectory(const Key& key) {
     UserHome* const home = homeOf(key);
     const auto seen = home ? home->look() : UserHome::Seen();
     if (home && seen.state == UserHome::State::missing)
-        return posixError(ZOR_HERE, ENOENT, "The home of user %u is not there; the next request looks for it again",
-                          key.userId);
+        return posixError(ZOR_HERE, Errno(ENOENT),
+                          "The home of user %u is not there; the next request looks for it again", key.userId);
     const auto directory = configuration_.containerDirectoryURLForUser(key.userId, key.containerClass, key.transient);
     if (!directory)
-        return posixError(ZOR_HERE, ENOENT, "User %u has no directory for class %s", key.userId,
+        return posixError(ZOR_HERE, Errno(ENOENT), "User %u has no directory for class %s", key.userId,
                           className(key.containerClass));
     ClassDirectoryReader reader(log_, fileManager_, *directory, key.userId);
     ClassCache cache{.entries = {}, .homeGeneration = seen.generation};
@@ -140,9 +141,9 @@ Result<ZORContainerCache::ClassCache> ZORContainerCache::readClassDirectory(cons
     // A daemon that was killed may have left containers here that are not on the disk yet; who finds one here is told
     // that it exists.
     const auto opened = fileManager_.resolver().openDirectory(*directory);
-    const int synced = opened ? durability_.afterMove(opened->get()) : -opened.error().number();
-    if (synced < 0)
-        return posixError(ZOR_HERE, -synced, "sync of %s failed: %s", directory->c_str(), errorText(-synced));
+    const Errno synced = opened ? durability_.afterMove(opened->get()) : opened.error();
+    if (synced)
+        return posixError(ZOR_HERE, synced, "sync of %s failed: %s", directory->c_str(), synced.text());
     return cache;
 }
 
@@ -203,8 +204,8 @@ bool ZORContainerCache::buildAllOfUser(std::uint32_t userId) {
             if (!configuration_.users().mayOwn(key.containerClass, userId))
                 continue;
             // A class that cannot be read holds nothing in memory either.
-            const int failure = lookForDirectory(key);
-            if (failure == 0) {
+            const Errno failure = lookForDirectory(key);
+            if (!failure) {
                 const MutexLock held(cacheLock_);
                 (void)_getCacheForUserId(key);
             }

@@ -66,7 +66,7 @@ Result<void> ZOREntitlementMapping::moveUnreadableFileAside() {
         return {};
     }
     if (!fileManager_.itemDoesNotExistAtURL(unreadableFileUrl_))
-        return posixError(ZOR_HERE, EIO, "stat of %s failed: %s", unreadableFileUrl_.c_str(), errorText(EIO));
+        return posixError(ZOR_HERE, Errno(EIO), "stat of %s failed: %s", unreadableFileUrl_.c_str(), Errno(EIO).text());
     TRY(fileManager_.moveItemAtURL(entitlementMappingFileUrl_, unreadableFileUrl_));
     fileIsUnread_ = false;
     log_.write(logLevelError, __func__,

@@ -181,12 +181,12 @@ Result<bool> ZORGlobalConfiguration::closeHomeDirectory() {
     Errno failure = !opened ? opened.error() : ::fstat(opened->get(), &status) != 0 ? Errno::last() : Errno();
     const bool isOpen = !failure && (status.st_mode & (S_IRWXG | S_IRWXO)) != 0;
     if (!failure && isOpen && status.st_uid == ::geteuid())
-        failure = Errno(-fileManager_.disk().changeMode(opened->get(), closedMode));
+        failure = fileManager_.disk().changeMode(opened->get(), closedMode);
     else if (isOpen)
         failure = Errno(EPERM);
     if (failure)
         return posixError(ZOR_HERE, failure, "%s cannot be closed to others, who may read what is deleted: %s",
-                          home.c_str(), errorText(failure));
+                          home.c_str(), failure.text());
     return isOpen;
 }
 

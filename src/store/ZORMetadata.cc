@@ -190,7 +190,7 @@ std::expected<std::shared_ptr<ZORMetadata>, MetadataRefusal> MetadataReader::jud
     if (!bytes) {
         const bool hidden = bytes.error() == ENOENT && fs::hidesNamesBelow(disk_, directory_, name);
         const Errno error = hidden ? Errno(ENOKEY) : bytes.error();
-        const ZORError cause = posixError(ZOR_HERE, error, "%s", errorText(error));
+        const ZORError cause = posixError(ZOR_HERE, error, "%s", error.text());
         return refusal(MetadataRule::readable, ErrorCode::metadataUnreadable, __LINE__,
                        formatted("Failed to read metadata at URL %s", place.url().c_str()),
                        std::make_shared<const ZORError>(cause));

@@ -37,8 +37,7 @@ std::optional<UsableDirectory> ZORPerUserConfiguration::openHome() {
     if (!home)
         return std::nullopt;
     if (!opened)
-        return judged(*home,
-                      posixError(ZOR_HERE, opened.error(), "open of the home failed: %s", errorText(opened.error())),
+        return judged(*home, posixError(ZOR_HERE, opened.error(), "open of the home failed: %s", opened.error().text()),
                       "userHomeDirectory", "user base");
     return UsableDirectory{.url = *home, .opened = std::move(*opened)};
 }

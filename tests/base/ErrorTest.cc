@@ -9,6 +9,7 @@
 #include "support/TestRoot.h"
 #include "support/Waiting.h"
 
+#include <concepts>
 #include <gtest/gtest.h>
 #include <sys/resource.h>
 #include <sys/wait.h>
@@ -20,7 +21,7 @@ using support::LogLine;
 
 // One line exactly when it is asked for, with the place and the cause; a system's number never passes for a code.
 TEST(Error, IsLoggedOnceWhereItIsMade) {
-    const ZORError cause = posixError({"rename", 7}, ENOENT, "rename of %s failed", "/a");
+    const ZORError cause = posixError({"rename", 7}, Errno(ENOENT), "rename of %s failed", "/a");
     support::RecordingLog sink(logLevelNotice);
     const Log log(sink);
     for (const LogFlag flag : {LogFlag::no, LogFlag::yes})
@@ -28,9 +29,23 @@ TEST(Error, IsLoggedOnceWhereItIsMade) {
                         .is(ErrorCode::moveToLiveFailed));
     EXPECT_EQ(sink.take(), (std::vector<LogLine>{{3, "operation", "42: moving 5 (POSIX 2 \"rename of /a failed\")"}}));
     for (const auto& [number, code] : {std::pair(EPERM, EACCES), {EAGAIN, 1000 + EAGAIN}, {ENOTEMPTY, ENOTEMPTY}})
-        EXPECT_EQ(posixError(ZOR_HERE, number, "x").replyCode(),
+        EXPECT_EQ(posixError(ZOR_HERE, Errno(number), "x").replyCode(),
                   static_cast<ErrorCode>(code)); // 1 is success, 11 a code
     EXPECT_FALSE(cause.is(static_cast<ErrorCode>(2)));
+}
+
+template <typename T>
+concept TakenForANumber = requires(T error) { -error; } || requires(T error) { error < 0; } ||
+                          std::convertible_to<T, int> || std::convertible_to<T, bool>;
+static_assert(!TakenForANumber<Errno>);
+
+// An error is no number of any sign, and is handed on from whatever carries it to whatever can.
+TEST(Error, NumberIsPositiveAndHandedOn) {
+    const auto value = [](int number) { return number == 0 ? ErrnoOr<int>(7) : Errno(number); };
+    const auto number = [&](int failure) -> Errno { return Errno(TRY(value(failure)) - 7); };
+    const auto word = [&](int failure) -> ErrnoOr<std::string> { return std::to_string(TRY(value(failure))); };
+    EXPECT_TRUE(!number(0) && number(ENOENT) == ENOENT && word(0) == "7" && word(EIO).error() == EIO);
+    EXPECT_DEATH((void)Errno(-ENOENT), "");
 }
 
 // Every handle state (0: no handle) against every level; a line that is not written has its arguments not evaluated.

@@ -649,8 +649,8 @@ public:
     using InterceptedDisk::InterceptedDisk;
 
 protected:
-    ssize_t intercept(const DiskCallInfo& info, const Make& make) override {
-        const ssize_t made = make();
+    zor::Errno intercept(const DiskCallInfo& info, const Make& make) override {
+        const zor::Errno made = make();
         if (info.call == DiskCall::makeDirectory && info.subject.starts_with(".install-")) {
             EXPECT_EQ(::renameat2(info.fd, "closed", info.fd, info.subject.c_str(), RENAME_EXCHANGE), 0);
         }

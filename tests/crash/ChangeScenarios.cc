@@ -21,9 +21,9 @@ Acknowledged makeWithContent(Device& device, bool transient, const std::string& 
     request.transient = transient;
     const Acknowledged made = device.mustCreate(request);
     const platform::FileDescriptor directory = openDirectory(made.path);
-    const platform::FileDescriptor file(device.disk->createFile(directory.get(), contentName, 0600));
-    must(device.disk->write(file.get(), bytesOf(content)) == 0 && device.disk->sync(file.get()) == 0 &&
-             device.disk->sync(directory.get()) == 0,
+    const auto file = device.disk->createFile(directory.get(), contentName, 0600);
+    must(file && !device.disk->write(file->get(), bytesOf(content)) && !device.disk->sync(file->get()) &&
+             !device.disk->sync(directory.get()),
          "no content");
     return made;
 }
@@ -162,7 +162,7 @@ StoppedReplace stopAfterFirstMove(Device& device, const Acknowledged& old, OldOn
         journal._writeToDiskReplaceAt(services.log(), services.defaultManager(),
                                       ReplaceJournal::urlFor(services.configuration().replaceDirectory(), uuid));
     must(written && services.defaultManager().moveItemAtURL(oldUrl, journal.stagingUrl) &&
-             device.disk->syncFileSystem(openDirectory(journal.stagingUrl.path()).get()) == 0,
+             !device.disk->syncFileSystem(openDirectory(journal.stagingUrl.path()).get()),
          "no stopped replace");
     return {.newUrl = journal.newUrl, .destUrl = journal.destUrl};
 }

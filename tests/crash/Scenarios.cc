@@ -16,10 +16,10 @@ constexpr const char* cachesPath = "/private/var/root/Library/Caches/com.veltra.
 
 void makeLeftover(Device& device, const std::string& parent, const char* name) {
     const platform::FileDescriptor directory = openDirectory(parent);
-    const bool made = device.disk->makeDirectory(directory.get(), name, 0755) == 0;
+    const bool made = !device.disk->makeDirectory(directory.get(), name, 0755);
     const platform::FileDescriptor leftover = openDirectory(directory.get(), name);
-    const platform::FileDescriptor file(device.disk->createFile(leftover.get(), "file", 0600));
-    must(made && device.disk->write(file.get(), bytesOf("x")) == 0, "no leftover");
+    const auto file = device.disk->createFile(leftover.get(), "file", 0600);
+    must(made && file && !device.disk->write(file->get(), bytesOf("x")), "no leftover");
 }
 
 /// A shared or system container that no identifier is entitled to goes at the next boot.

@@ -99,12 +99,12 @@ enum class Home { onRoot, mounted };
 class WithoutExchange final : public InterceptedDisk {
 public:
     using InterceptedDisk::InterceptedDisk;
-    int rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) override {
-        return flags == RENAME_EXCHANGE ? -EINVAL : inner().rename(fromDirectory, from, toDirectory, to, flags);
+    Errno rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) override {
+        return flags == RENAME_EXCHANGE ? Errno(EINVAL) : inner().rename(fromDirectory, from, toDirectory, to, flags);
     }
 
 private:
-    ssize_t intercept(const DiskCallInfo&, const Make& make) override { return make(); }
+    Errno intercept(const DiskCallInfo&, const Make& make) override { return make(); }
 };
 
 /// A device for one run of a fault loop: its root, and what its clients were promised.

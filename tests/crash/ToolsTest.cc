@@ -33,17 +33,16 @@ const Protocol protocols[] = {
     {"mode after sync", "Cwsmrd", true, false},      {"file system synced", "Cwmara", true, true},
 };
 
-/// 0, or a negative errno of the step that failed.
-int replaceBy(const std::string& steps, platform::Disk& disk, int directory) {
+Errno replaceBy(const std::string& steps, platform::Disk& disk, int directory) {
     platform::FileDescriptor file;
-    const auto opened = [&](int fd) {
-        file.reset(fd);
-        return std::min(fd, 0);
+    const auto opened = [&](ErrnoOr<platform::FileDescriptor> made) -> Errno {
+        file = TRY(std::move(made));
+        return Errno();
     };
-    const std::map<char, std::function<int()>> does = {
+    const std::map<char, std::function<Errno()>> does = {
         {'c', [&] { return opened(disk.createFile(directory, ".t", newMode)); }},
         {'C', [&] { return opened(disk.createFile(directory, ".t", 0600)); }},
-        {'i', [&] { return opened(::openat(directory, "f", O_RDWR | O_CLOEXEC)); }},
+        {'i', [&] { return opened(platform::FileDescriptor(::openat(directory, "f", O_RDWR | O_CLOEXEC))); }},
         {'w', [&] { return disk.write(file.get(), bytesOf(newContent)); }},
         {'m', [&] { return disk.changeMode(file.get(), newMode); }},
         {'s', [&] { return disk.sync(file.get()); }},
@@ -52,10 +51,9 @@ int replaceBy(const std::string& steps, platform::Disk& disk, int directory) {
         {'d', [&] { return disk.sync(directory); }},
         {'a', [&] { return disk.syncFileSystem(directory); }},
     };
-    int result = 0;
     for (const char step : steps)
-        result = result < 0 ? result : does.at(step)();
-    return std::min(result, 0);
+        TRY(does.at(step)());
+    return Errno();
 }
 
 std::string judge(const PowerCutState& state, const std::string& directory) {
@@ -83,7 +81,7 @@ TEST(PowerCutModelTest, TellsSoundFromWrong) {
         platform::LinuxDisk linuxDisk;
         RecordingDisk disk(linuxDisk, root.path());
         disk.start();
-        ASSERT_EQ(replaceBy(protocol.steps, disk, directory.get()), 0);
+        ASSERT_FALSE(replaceBy(protocol.steps, disk, directory.get()));
         disk.mark();
         ASSERT_EQ(disk.complaint(), "");
         for (const std::uint64_t seed : {1, 2, 3})

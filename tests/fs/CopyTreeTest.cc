@@ -189,7 +189,7 @@ TEST_P(CopyFidelity, KeepsWhatIsMeantToBeKept) {
             continue;
         }
         setOldTimes(original);
-        ASSERT_EQ(copyTree(disk, from.get(), row.name, to.get(), name.c_str()), 0);
+        ASSERT_FALSE(copyTree(disk, from.get(), row.name, to.get(), name.c_str()));
         const struct stat a = statusOf(AT_FDCWD, original);
         const struct stat b = statusOf(AT_FDCWD, copy);
         EXPECT_EQ(a.st_mode & ~row.modeBitsDropped, b.st_mode);
@@ -210,7 +210,7 @@ TEST_P(CopyFidelity, KeepsWhatIsMeantToBeKept) {
         if (row.check)
             row.check(original, copy);
         // An item that exists is never replaced or added to.
-        EXPECT_EQ(copyTree(disk, from.get(), row.name, to.get(), name.c_str()), -EEXIST);
+        EXPECT_EQ(copyTree(disk, from.get(), row.name, to.get(), name.c_str()).number(), EEXIST);
     }
     EXPECT_EQ(before.leakedSince(), "");
 }
@@ -219,14 +219,14 @@ TEST_P(CopyFidelity, KeepsWhatIsMeantToBeKept) {
 TEST(CopyTree, RefusesWhatItCannotCopy) {
     World world;
     makeDirectory(world.fd(), "tree");
-    EXPECT_EQ(copyTree(world.disk, world.fd(), "missing", world.fd(), ".copy"), -ENOENT);
+    EXPECT_EQ(copyTree(world.disk, world.fd(), "missing", world.fd(), ".copy").number(), ENOENT);
     ASSERT_EQ(::mknodat(world.fd(), "socket", S_IFSOCK | 0600, 0), 0);
-    EXPECT_EQ(copyTree(world.disk, world.fd(), "socket", world.fd(), ".copy"), -EOPNOTSUPP);
+    EXPECT_EQ(copyTree(world.disk, world.fd(), "socket", world.fd(), ".copy").number(), EOPNOTSUPP);
     if (::mknodat(world.fd(), "tree/device", S_IFCHR | 0600, 0x0103) != 0)
         GTEST_SKIP() << "device nodes are not permitted";
-    EXPECT_EQ(copyTree(world.disk, world.fd(), "tree", world.fd(), ".copy"), -EPERM);
+    EXPECT_EQ(copyTree(world.disk, world.fd(), "tree", world.fd(), ".copy").number(), EPERM);
     EXPECT_FALSE(exists(world.fd(), ".copy/device"));
-    EXPECT_EQ(copyTree(world.disk, world.fd(), "tree/device", world.fd(), ".copy2"), -EPERM);
+    EXPECT_EQ(copyTree(world.disk, world.fd(), "tree/device", world.fd(), ".copy2").number(), EPERM);
 }
 
 // A file of another owner below a directory that others can read is never readable in the half-made copy.
@@ -243,7 +243,7 @@ TEST(CopyTree, IsClosedToOthersUntilItIsWhole) {
         EXPECT_TRUE(isWhole || (statusOf(world.fd(), ".copy").st_mode & 077) == 0);
         ++looks;
     };
-    EXPECT_EQ(copyTree(disk, world.fd(), "tree", world.fd(), ".copy"), 0);
+    EXPECT_FALSE(copyTree(disk, world.fd(), "tree", world.fd(), ".copy"));
     EXPECT_GT(looks, 0U);
 }
 
@@ -262,7 +262,7 @@ TEST(CopyTree, FillsOnlyTheDirectoryItMade) {
             while (!stopped && ::renameat2(world.fd(), ".copy", world.fd(), "victim", RENAME_EXCHANGE) != 0) {
             }
         });
-        refused += copyTree(world.disk, world.fd(), "tree", world.fd(), ".copy") == -ESTALE ? 1 : 0;
+        refused += copyTree(world.disk, world.fd(), "tree", world.fd(), ".copy") == ESTALE ? 1 : 0;
         stopped = true;
         swapper.join();
         if (exists(world.fd(), ".copy/keep")) {
@@ -271,7 +271,7 @@ TEST(CopyTree, FillsOnlyTheDirectoryItMade) {
         EXPECT_TRUE(exists(world.fd(), "victim/keep"));
         EXPECT_FALSE(exists(world.fd(), "victim/f"));
         EXPECT_EQ(statusOf(world.fd(), "victim").st_mode & 0777, 0700U);
-        EXPECT_EQ(removeTree(world.disk, world.fd(), ".copy"), 0);
+        EXPECT_FALSE(removeTree(world.disk, world.fd(), ".copy"));
     };
     repeatForRace(copyAside, [&] { return refused == 20; });
 }

@@ -115,8 +115,8 @@ public:
     ExchangingDisk(Disk& inner, std::string other) : InterceptedDisk(inner), other_(std::move(other)) {}
 
 protected:
-    ssize_t intercept(const support::DiskCallInfo& info, const Make& make) override {
-        const ssize_t made = make();
+    Errno intercept(const support::DiskCallInfo& info, const Make& make) override {
+        const Errno made = make();
         if (info.call == DiskCall::makeDirectory) {
             EXPECT_EQ(::renameat2(AT_FDCWD, other_.c_str(), info.fd, info.subject.c_str(), RENAME_EXCHANGE), 0);
         }
@@ -274,7 +274,7 @@ TEST_F(FileManager, AFileIsReplacedWhateverLiesInTheWay) {
         makeItems({"d/", "d/f", before});
         const platform::FileDescriptor directory(::open(path("d").c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
         const mode_t mask = ::umask(077);
-        EXPECT_EQ(replaceFileDurably(disk, directory.get(), "f", 0644, bytes), 0);
+        EXPECT_FALSE(replaceFileDurably(disk, directory.get(), "f", 0644, bytes));
         ::umask(mask);
         EXPECT_EQ(read("d/f"), "new");
         EXPECT_TRUE(item("d/f").starts_with("file 0644"));

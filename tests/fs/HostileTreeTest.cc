@@ -15,14 +15,14 @@ void copyOften(World& world) {
         std::string source = "tree/wide/f" + std::to_string(turn % World::wideCount);
         if (turn < 4)
             source = turn == 0 ? "tree" : "tree/wide";
-        copyTree(world.disk, world.fd(), source.c_str(), world.fd(), ".copy");
+        (void)copyTree(world.disk, world.fd(), source.c_str(), world.fd(), ".copy");
         if (!exists(world.fd(), ".copy"))
             continue;
         if (turn < 4) {
             for (const auto& [id, inode] : support::readTree(world.path() + "/.copy").inodes)
                 EXPECT_NE(std::string(inode.content.begin(), inode.content.end()), World::secret);
         }
-        EXPECT_EQ(removeTree(world.disk, world.fd(), ".copy"), 0);
+        EXPECT_FALSE(removeTree(world.disk, world.fd(), ".copy"));
     }
 }
 
@@ -41,7 +41,7 @@ TEST(HostileTree, NothingLeadsOutside) {
          [&](World& world) {
              TreeWalker walker;
              std::size_t deepest = 0;
-             walker.walk(world.fd(), "tree", [&](const WalkEntry& entry) {
+             (void)walker.walk(world.fd(), "tree", [&](const WalkEntry& entry) {
                  EXPECT_FALSE(forbidden.contains(entry.status.st_ino)) << entry.path();
                  if (entry.directory >= 0)
                      ::fchmod(entry.directory, 0711);
@@ -55,13 +55,13 @@ TEST(HostileTree, NothingLeadsOutside) {
          [](World& world) {
              EXPECT_LT(diskUsage(openDirectory(world.fd(), "tree").get(), "/r", {}).bytes, World::outsideBytes);
          }},
-        {"removal", 1, [](World& world) { removeTree(world.disk, world.fd(), "tree"); }},
+        {"removal", 1, [](World& world) { (void)removeTree(world.disk, world.fd(), "tree"); }},
     };
     for (const auto& [name, times, operation] : operations) {
         SCOPED_TRACE(name);
         World world;
         forbidden.clear();
-        TreeWalker(WalkStatus::full).walk(world.fd(), "outside", [&](const WalkEntry& entry) {
+        (void)TreeWalker(WalkStatus::full).walk(world.fd(), "outside", [&](const WalkEntry& entry) {
             forbidden.insert(entry.status.st_ino);
             return WalkStep::proceed;
         });
@@ -74,8 +74,8 @@ TEST(HostileTree, NothingLeadsOutside) {
                     for (int i = 0; i < times; ++i)
                         operation(world);
                 }
-                removeTree(world.disk, world.fd(), "tree");
-                removeTree(world.disk, world.fd(), "outside/parking/moved");
+                (void)removeTree(world.disk, world.fd(), "tree");
+                (void)removeTree(world.disk, world.fd(), "outside/parking/moved");
                 EXPECT_FALSE(exists(world.fd(), "tree"));
                 EXPECT_EQ(world.damage(), "");
             });
@@ -126,25 +126,25 @@ TEST(HostileTree, AnyDepthAndWidth) {
     const std::size_t descriptorsBefore = openDescriptorCount();
     const std::size_t residentBefore = residentBytes();
     TreeWalker walker;
-    const int walked = walker.walk(root.get(), "tree", [&](const WalkEntry&) {
+    const Errno walked = walker.walk(root.get(), "tree", [&](const WalkEntry&) {
         if (++visited % 1000 == 0)
             descriptorsMost = std::max(descriptorsMost, openDescriptorCount());
         return WalkStep::proceed;
     });
-    EXPECT_EQ(walked, 0);
+    EXPECT_FALSE(walked);
     EXPECT_EQ(visited, 3 * (depth + width) + 9);
     EXPECT_EQ(walker.vanishedDirectories(), 0U);
     EXPECT_LE(descriptorsMost - descriptorsBefore, 64U);
     EXPECT_LT(residentBytes(), residentBefore + 8 * 1024 * 1024);
     EXPECT_EQ(diskUsage(openDirectory(root.get(), "tree").get(), "/r", {}).bytes, bytes);
     platform::LinuxDisk disk;
-    ASSERT_EQ(copyTree(disk, root.get(), "tree/deep/d", root.get(), "copy"), 0);
+    ASSERT_FALSE(copyTree(disk, root.get(), "tree/deep/d", root.get(), "copy"));
     std::size_t levels = 1;
     for (FileDescriptor level = openDirectory(root.get(), "copy"); exists(level.get(), "d"); ++levels)
         level = openDirectory(level.get(), "d");
     EXPECT_EQ(levels, depth);
     for (const char* name : {"copy", "tree"})
-        EXPECT_EQ(removeTree(disk, root.get(), name), 0);
+        EXPECT_FALSE(removeTree(disk, root.get(), name));
 }
 
 } // namespace

@@ -33,7 +33,7 @@ struct Said {
     RemoveCallbacks callbacks() {
         return {.failed =
                     [this](const RemoveFailure& failure) {
-                        text += failure.path + ":" + std::to_string(failure.error) + " ";
+                        text += failure.path + ":" + std::to_string(failure.error.number()) + " ";
                     },
                 .directoryMadeMutable = [this](const std::string& path) { text += "+" + path + " "; }};
     }
@@ -49,12 +49,12 @@ TEST(RemoveTree, ClearsFlagsOfDirectoriesInsideTheTree) {
         const char* said;
         int result;
     } cases[] = {
-        {"top/tree/a/b/file", FS_IMMUTABLE_FL, "a/b/file:1 a/b:39 a:39 :39 ", -EPERM},
-        {"top/tree/a/b/file", FS_APPEND_FL, "a/b/file:1 a/b:39 a:39 :39 ", -EPERM},
+        {"top/tree/a/b/file", FS_IMMUTABLE_FL, "a/b/file:1 a/b:39 a:39 :39 ", EPERM},
+        {"top/tree/a/b/file", FS_APPEND_FL, "a/b/file:1 a/b:39 a:39 :39 ", EPERM},
         {"top/tree/a/b", FS_IMMUTABLE_FL, "+a/b ", 0},
         {"top/tree/a/b", FS_APPEND_FL, "+a/b ", 0},
         {"top/tree", FS_IMMUTABLE_FL, "+ ", 0},
-        {"top", FS_IMMUTABLE_FL, ":1 ", -EPERM},
+        {"top", FS_IMMUTABLE_FL, ":1 ", EPERM},
     };
     if (::geteuid() != 0)
         GTEST_SKIP() << "only root may set inode flags";
@@ -69,9 +69,9 @@ TEST(RemoveTree, ClearsFlagsOfDirectoriesInsideTheTree) {
                 GTEST_SKIP() << "no inode flags in /tmp";
             const FileDescriptor top = openDirectory(root.get(), "top");
             Said said;
-            const int result = withCallbacks ? removeTree(disk, top.get(), "tree", said.callbacks())
-                                             : removeTree(disk, top.get(), "tree");
-            EXPECT_EQ(result, withCallbacks ? 0 : row.result) << row.path;
+            const Errno result = withCallbacks ? removeTree(disk, top.get(), "tree", said.callbacks())
+                                               : removeTree(disk, top.get(), "tree");
+            EXPECT_EQ(result.number(), withCallbacks ? 0 : row.result) << row.path;
             EXPECT_EQ(said.text, withCallbacks ? row.said : "") << row.path;
             EXPECT_EQ(exists(top.get(), "tree"), row.result != 0) << row.path;
             EXPECT_FALSE(exists(top.get(), "tree/a/empty")) << row.path;
@@ -96,16 +96,17 @@ TEST(RemoveTree, LetsACallbackRepairImmutableFiles) {
         !setFlags(root.get(), "outside", FS_IMMUTABLE_FL))
         GTEST_SKIP() << "no inode flags in /tmp";
     platform::LinuxDisk disk;
-    for (const auto& [name, cleared] : {std::pair("link", 0), {"fifo", 0}, {"tree", 0}, {"missing", -ENOENT}})
-        EXPECT_EQ(clearImmutable(disk, root.get(), name), cleared) << name;
+    for (const char* const name : {"link", "fifo", "tree"})
+        EXPECT_EQ(clearImmutable(disk, root.get(), name), false) << name;
+    EXPECT_EQ(clearImmutable(disk, root.get(), "missing").error().number(), ENOENT);
     EXPECT_EQ(flagsOf(root.get(), "outside"), FS_IMMUTABLE_FL);
     setFlags(root.get(), "outside", 0);
     const RemoveCallbacks callbacks = {.failed = [&](const RemoveFailure& failure) {
-        EXPECT_EQ(failure.path + std::to_string(failure.error), "file1");
-        EXPECT_EQ(clearImmutable(disk, failure.parent, failure.name), 1);
-        EXPECT_EQ(disk.unlinkFile(failure.parent, failure.name), 0);
+        EXPECT_EQ(failure.path + std::to_string(failure.error.number()), "file1");
+        EXPECT_EQ(clearImmutable(disk, failure.parent, failure.name), true);
+        EXPECT_FALSE(disk.unlinkFile(failure.parent, failure.name));
     }};
-    EXPECT_EQ(removeTree(disk, root.get(), "tree", callbacks), 0);
+    EXPECT_FALSE(removeTree(disk, root.get(), "tree", callbacks));
     EXPECT_FALSE(exists(root.get(), "tree"));
 }
 
@@ -122,9 +123,9 @@ TEST(RemoveTree, RemovesWhatIsAddedMeanwhile) {
         }
     };
     Said said;
-    EXPECT_EQ(removeTree(disk, world.fd(), "tree", said.callbacks()), 0);
+    EXPECT_FALSE(removeTree(disk, world.fd(), "tree", said.callbacks()));
     EXPECT_EQ(additions, 10);
-    EXPECT_EQ(removeTree(disk, world.fd(), "tree", said.callbacks()), -ENOENT);
+    EXPECT_EQ(removeTree(disk, world.fd(), "tree", said.callbacks()).number(), ENOENT);
     EXPECT_EQ(said.text, "");
 
     makeDirectory(world.fd(), "tree");
@@ -135,7 +136,7 @@ TEST(RemoveTree, RemovesWhatIsAddedMeanwhile) {
             makeLink(world.fd(), "tree", world.path() + "/outside");
         }
     };
-    EXPECT_EQ(removeTree(disk, world.fd(), "tree"), 0);
+    EXPECT_FALSE(removeTree(disk, world.fd(), "tree"));
     EXPECT_FALSE(exists(world.fd(), "tree"));
     EXPECT_EQ(world.damage(), "");
 }

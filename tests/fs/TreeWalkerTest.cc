@@ -21,7 +21,7 @@ std::set<std::string> visits(TreeWalker& walker, int parent, const char* name) {
                                                                {WalkEntryKind::other, "other "},
                                                                {WalkEntryKind::noStatus, "no status "}};
     std::set<std::string> seen;
-    walker.walk(parent, name, [&](const WalkEntry& entry) {
+    (void)walker.walk(parent, name, [&](const WalkEntry& entry) {
         EXPECT_TRUE(
             seen.insert(texts.at(entry.kind) + entry.path() + (entry.onOtherFileSystem ? " (away)" : "")).second);
         return WalkStep::proceed;
@@ -49,10 +49,12 @@ TEST(TreeWalker, VisitsEveryItemOfATree) {
     }
     TreeWalker walker;
     const auto proceed = [](const WalkEntry&) { return WalkStep::proceed; };
-    EXPECT_EQ(walker.walk(root.get(), "missing", proceed), -ENOENT);
-    EXPECT_EQ(walker.walk(root.get(), "tree",
-                          [](const WalkEntry& e) { return e.depth > 0 ? WalkStep::stop : WalkStep::proceed; }),
-              -ECANCELED);
+    EXPECT_EQ(walker.walk(root.get(), "missing", proceed).number(), ENOENT);
+    EXPECT_EQ(walker
+                  .walk(root.get(), "tree",
+                        [](const WalkEntry& e) { return e.depth > 0 ? WalkStep::stop : WalkStep::proceed; })
+                  .number(),
+              ECANCELED);
 }
 
 // Directories moved away while the walk is below them, deeper than it keeps descriptors: it goes on where it may,
@@ -83,7 +85,7 @@ TEST(TreeWalker, GoesUpOnlyIntoDirectoriesItCameFrom) {
             chain.push_back(statusOf(world.fd(), "tree/" + chainPath(depth)).st_ino);
         std::set<std::size_t> ended;
         TreeWalker walker;
-        const int result = walker.walk(world.fd(), "tree", [&](const WalkEntry& entry) {
+        const Errno result = walker.walk(world.fd(), "tree", [&](const WalkEntry& entry) {
             // Only the place to which directories are moved has this name in it.
             EXPECT_FALSE(exists(entry.parent, "keep")) << move.name;
             if (entry.kind != WalkEntryKind::directoryEnd || entry.depth > World::chainDepth ||
@@ -103,7 +105,7 @@ TEST(TreeWalker, GoesUpOnlyIntoDirectoriesItCameFrom) {
             }
             return WalkStep::proceed;
         });
-        EXPECT_EQ(result, 0) << move.name;
+        EXPECT_FALSE(result) << move.name;
         EXPECT_EQ(walker.vanishedDirectories(), move.lost) << move.name;
         EXPECT_EQ(ended.size(), World::chainDepth + 1 - move.lost) << move.name;
         EXPECT_TRUE(ended.contains(0)) << move.name;
@@ -116,7 +118,7 @@ TEST(TreeWalker, VisitsWhatANameIsNow) {
     makeItems(world.fd(), {"tree/", "tree/a/", "tree/b/"});
     std::vector<WalkEntryKind> kinds;
     TreeWalker walker;
-    walker.walk(world.fd(), "tree", [&](const WalkEntry& entry) {
+    (void)walker.walk(world.fd(), "tree", [&](const WalkEntry& entry) {
         if (entry.depth == 0)
             return WalkStep::proceed;
         const std::string other = entry.name == std::string("a") ? "tree/b" : "tree/a";

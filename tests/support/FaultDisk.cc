@@ -32,43 +32,41 @@ DiskCallInfo FaultDisk::metCall() const {
     return metCall_;
 }
 
-int FaultDisk::faultOf(const DiskCallInfo& info) {
+Errno FaultDisk::faultOf(const DiskCallInfo& info) {
     const MutexLock lock(mutex_);
     if (armed_ && !stopped_) {
         if (fault_.filter && !fault_.filter(info))
-            return 0;
+            return Errno();
         ++counted_;
         if (counted_ < fault_.point || (counted_ > fault_.point && fault_.span == FaultSpan::once))
-            return 0;
+            return Errno();
         if (!met_)
             metCall_ = info;
         met_ = true;
         if (fault_.kind == FaultKind::error)
-            return -fault_.error;
+            return Errno(fault_.error);
         stopped_ = true;
     }
     if (!stopped_)
-        return 0;
+        return Errno();
     if (std::uncaught_exceptions() > 0)
-        return -EIO;
+        return Errno(EIO);
     throw ProcessStopped{};
 }
 
-ssize_t FaultDisk::intercept(const DiskCallInfo& info, const Make& make) {
+Errno FaultDisk::intercept(const DiskCallInfo& info, const Make& make) {
     if (before)
         before(info);
-    const int fault = faultOf(info);
-    return fault != 0 ? fault : make();
+    TRY(faultOf(info));
+    return make();
 }
 
-int FaultDisk::write(int fd, std::span<const std::uint8_t> bytes) {
+Errno FaultDisk::write(int fd, std::span<const std::uint8_t> bytes) {
     if (bytes.size() < 2)
         return InterceptedDisk::write(fd, bytes);
     const std::size_t half = bytes.size() / 2;
-    if (const int result = InterceptedDisk::write(fd, bytes.first(half)); result != 0)
-        return result;
-    return static_cast<int>(
-        intercept({DiskCall::write, "(second half)", fd}, [&] { return inner().write(fd, bytes.subspan(half)); }));
+    TRY(InterceptedDisk::write(fd, bytes.first(half)));
+    return intercept({DiskCall::write, "(second half)", fd}, [&] { return inner().write(fd, bytes.subspan(half)); });
 }
 
 const char* nameOf(DiskCall call) {

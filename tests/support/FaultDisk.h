@@ -6,10 +6,11 @@
 //
 // A stop is an object that no handler of the daemon's own errors takes (it is no std::exception). From then on the disk
 // does not change any more, as after the death of a process: each further call throws the same again, or, while the
-// stack unwinds (destructors may not throw), returns -EIO.
+// stack unwinds (destructors may not throw), answers EIO.
 #pragma once
 
 #include "base/Mutex.h"
+#include "platform/Errno.h"
 #include "support/InterceptedDisk.h"
 
 #include <cerrno>
@@ -46,27 +47,27 @@ public:
     [[nodiscard]] bool met() const;
     [[nodiscard]] DiskCallInfo metCall() const;
 
-    int write(int fd, std::span<const std::uint8_t> bytes) override;
+    Errno write(int fd, std::span<const std::uint8_t> bytes) override;
     /// Directories that are encrypted as far as the daemon can see, besides those that are; their names stay readable.
     [[nodiscard]] bool hidesNames(int directory) override {
         return (locked && locked(directory)) || InterceptedDisk::hidesNames(directory);
     }
     std::function<bool(int directory)> locked;
     /// Files that cannot be read: the errno, or 0.
-    [[nodiscard]] ssize_t read(int fd, std::span<std::uint8_t> bytes) override {
-        const int refused = unreadable ? unreadable(fd) : 0;
-        return refused != 0 ? -refused : InterceptedDisk::read(fd, bytes);
+    ErrnoOr<std::size_t> read(int fd, std::span<std::uint8_t> bytes) override {
+        TRY(Errno(unreadable ? unreadable(fd) : 0));
+        return InterceptedDisk::read(fd, bytes);
     }
     std::function<int(int fd)> unreadable;
     /// Runs before each call, on its thread and under no lock of this disk's.
     std::function<void(const DiskCallInfo&)> before;
 
 protected:
-    ssize_t intercept(const DiskCallInfo& info, const Make& make) override;
+    Errno intercept(const DiskCallInfo& info, const Make& make) override;
 
 private:
-    /// 0 to go on, the negative errno to return, or the end.
-    int faultOf(const DiskCallInfo& info);
+    /// No error: go on. Or the end.
+    Errno faultOf(const DiskCallInfo& info);
 
     mutable platform::Mutex mutex_;
     Fault fault_ ZOR_GUARDED_BY(mutex_);

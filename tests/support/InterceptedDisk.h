@@ -2,8 +2,10 @@
 // A Disk before another one that brings all calls to one place, which may refuse them, make them or watch them.
 #pragma once
 
+#include "base/Try.h"
 #include "os/FileDescriptor.h"
 #include "platform/Disk.h"
+#include "platform/Errno.h"
 
 #include <cerrno>
 #include <fcntl.h>
@@ -57,81 +59,92 @@ class InterceptedDisk : public platform::Disk {
 public:
     explicit InterceptedDisk(platform::Disk& inner) : inner_(inner) {}
 
-    int makeDirectory(int at, const char* name, mode_t mode) override {
+    Errno makeDirectory(int at, const char* name, mode_t mode) override {
         return pass(DiskCall::makeDirectory, name, at, [&] { return inner_.makeDirectory(at, name, mode); });
     }
-    int createFile(int at, const char* name, mode_t mode) override {
-        return pass(DiskCall::createFile, name, at, [&] { return inner_.createFile(at, name, mode); });
+    ErrnoOr<platform::FileDescriptor> createFile(int at, const char* name, mode_t mode) override {
+        return passFor<platform::FileDescriptor>({DiskCall::createFile, name, at},
+                                                 [&] { return inner_.createFile(at, name, mode); });
     }
-    int makeSymbolicLink(const char* target, int at, const char* name) override {
+    Errno makeSymbolicLink(const char* target, int at, const char* name) override {
         return pass(DiskCall::makeSymbolicLink, name, at, [&] { return inner_.makeSymbolicLink(target, at, name); });
     }
-    int makeHardLink(int fromDirectory, const char* from, int toDirectory, const char* to) override {
+    Errno makeHardLink(int fromDirectory, const char* from, int toDirectory, const char* to) override {
         return pass(DiskCall::makeHardLink, std::string(from) + " -> " + to, fromDirectory,
                     [&] { return inner_.makeHardLink(fromDirectory, from, toDirectory, to); });
     }
-    int makeFifo(int at, const char* name, mode_t mode) override {
+    Errno makeFifo(int at, const char* name, mode_t mode) override {
         return pass(DiskCall::makeFifo, name, at, [&] { return inner_.makeFifo(at, name, mode); });
     }
-    int rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) override {
+    Errno rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) override {
         return pass(DiskCall::rename, std::string(from) + " -> " + to, fromDirectory,
                     [&] { return inner_.rename(fromDirectory, from, toDirectory, to, flags); });
     }
-    int unlinkFile(int at, const char* name) override {
+    Errno unlinkFile(int at, const char* name) override {
         return pass(DiskCall::unlinkFile, name, at, [&] { return inner_.unlinkFile(at, name); });
     }
-    int removeDirectory(int at, const char* name) override {
+    Errno removeDirectory(int at, const char* name) override {
         return pass(DiskCall::removeDirectory, name, at, [&] { return inner_.removeDirectory(at, name); });
     }
-    int changeMode(int fd, mode_t mode) override {
+    Errno changeMode(int fd, mode_t mode) override {
         return pass(DiskCall::changeMode, "", fd, [&] { return inner_.changeMode(fd, mode); });
     }
-    int changeOwner(int fd, uid_t uid, gid_t gid) override {
+    Errno changeOwner(int fd, uid_t uid, gid_t gid) override {
         return pass(DiskCall::changeOwner, "", fd, [&] { return inner_.changeOwner(fd, uid, gid); });
     }
-    int changeOwnerOf(int at, const char* name, uid_t uid, gid_t gid) override {
+    Errno changeOwnerOf(int at, const char* name, uid_t uid, gid_t gid) override {
         const platform::FileDescriptor item(::openat(at, name, O_PATH | O_NOFOLLOW | O_CLOEXEC));
-        return item.valid() ? changeOwner(item.get(), uid, gid) : -errno;
+        return item.valid() ? changeOwner(item.get(), uid, gid) : Errno::last();
     }
-    int setTimes(int fd, const timespec& access, const timespec& modification) override {
+    Errno setTimes(int fd, const timespec& access, const timespec& modification) override {
         return pass(DiskCall::setTimes, "", fd, [&] { return inner_.setTimes(fd, access, modification); });
     }
-    int setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) override {
+    Errno setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) override {
         return pass(DiskCall::setAttribute, name, fd, [&] { return inner_.setAttribute(fd, name, value); });
     }
-    int setInodeFlags(int fd, int flags) override {
+    Errno setInodeFlags(int fd, int flags) override {
         return pass(DiskCall::setInodeFlags, "", fd, [&] { return inner_.setInodeFlags(fd, flags); });
     }
-    int write(int fd, std::span<const std::uint8_t> bytes) override {
+    Errno write(int fd, std::span<const std::uint8_t> bytes) override {
         return pass(DiskCall::write, "", fd, [&] { return inner_.write(fd, bytes); });
     }
-    int cloneData(int from, int to) override {
+    Errno cloneData(int from, int to) override {
         return pass(DiskCall::cloneData, "", from, [&] { return inner_.cloneData(from, to); });
     }
-    ssize_t copyData(int from, int to, std::size_t bytesMax) override {
-        return intercept({DiskCall::copyData, "", from}, [&] { return inner_.copyData(from, to, bytesMax); });
+    ErrnoOr<std::size_t> copyData(int from, int to, std::size_t bytesMax) override {
+        return passFor<std::size_t>({DiskCall::copyData, "", from},
+                                    [&] { return inner_.copyData(from, to, bytesMax); });
     }
-    int sync(int fd) override {
+    Errno sync(int fd) override {
         return pass(DiskCall::sync, "", fd, [&] { return inner_.sync(fd); });
     }
-    int syncFileSystem(int fd) override {
+    Errno syncFileSystem(int fd) override {
         return pass(DiskCall::syncFileSystem, "", fd, [&] { return inner_.syncFileSystem(fd); });
     }
-    int orderData(int fd) override {
+    Errno orderData(int fd) override {
         return pass(DiskCall::orderData, "", fd, [&] { return inner_.orderData(fd); });
     }
-    [[nodiscard]] ssize_t read(int fd, std::span<std::uint8_t> bytes) override { return inner_.read(fd, bytes); }
+    ErrnoOr<std::size_t> read(int fd, std::span<std::uint8_t> bytes) override { return inner_.read(fd, bytes); }
     [[nodiscard]] bool hidesNames(int directory) override { return inner_.hidesNames(directory); }
 
 protected:
     /// `make` makes the call on the inner disk.
-    using Make = std::function<ssize_t()>;
-    virtual ssize_t intercept(const DiskCallInfo& info, const Make& make) = 0;
+    using Make = std::function<Errno()>;
+    virtual Errno intercept(const DiskCallInfo& info, const Make& make) = 0;
     [[nodiscard]] platform::Disk& inner() { return inner_; }
 
 private:
-    int pass(DiskCall call, std::string subject, int fd, const Make& make) {
-        return static_cast<int>(intercept({call, std::move(subject), fd}, make));
+    Errno pass(DiskCall call, std::string subject, int fd, const Make& make) {
+        return intercept({call, std::move(subject), fd}, make);
+    }
+    template <typename T, typename Call>
+    ErrnoOr<T> passFor(const DiskCallInfo& info, const Call& call) {
+        ErrnoOr<T> result = Errno(ECANCELED);
+        TRY(intercept(info, [&] {
+            result = call();
+            return result ? Errno() : result.error();
+        }));
+        return result;
     }
 
     platform::Disk& inner_;

@@ -202,11 +202,9 @@ void RecordingDisk::addData(int to, std::uint64_t offset, Bytes bytes) {
     add(std::move(operation));
 }
 
-ssize_t RecordingDisk::intercept(const DiskCallInfo& info, const Make& make) {
+Errno RecordingDisk::intercept(const DiskCallInfo& info, const Make& make) {
     const MutexLock lock(mutex_);
-    const ssize_t result = make();
-    if (result < 0)
-        return result;
+    TRY(make());
     const DiskCall call = info.call;
     struct stat synced = {};
     if (LoggedOperation{.call = call}.makesInode())
@@ -219,14 +217,12 @@ ssize_t RecordingDisk::intercept(const DiskCallInfo& info, const Make& make) {
     else if (call == DiskCall::syncFileSystem && recording_ && ::fstat(info.fd, &synced) == 0)
         add({.call = call, .device = synced.st_dev});
     // The others have methods of their own, or are not modelled.
-    return result;
+    return Errno();
 }
 
-int RecordingDisk::makeHardLink(int fromDirectory, const char* from, int toDirectory, const char* to) {
+Errno RecordingDisk::makeHardLink(int fromDirectory, const char* from, int toDirectory, const char* to) {
     const MutexLock lock(mutex_);
-    const int result = inner().makeHardLink(fromDirectory, from, toDirectory, to);
-    if (result != 0)
-        return result;
+    TRY(inner().makeHardLink(fromDirectory, from, toDirectory, to));
     const Place source = place(fromDirectory, from);
     const Place link = place(toDirectory, to);
     const InodeId id = source.directory == 0 ? 0 : findEntry(source.directory, source.name);
@@ -234,22 +230,20 @@ int RecordingDisk::makeHardLink(int fromDirectory, const char* from, int toDirec
         add({.call = DiskCall::makeHardLink, .inode = id, .directory = link.directory, .name = link.name});
     else if (link.directory != 0 || source.directory != 0)
         complaint_ += std::string("a link \"") + to + "\" to what is not recorded; ";
-    return result;
+    return Errno();
 }
 
-int RecordingDisk::rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) {
+Errno RecordingDisk::rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) {
     const MutexLock lock(mutex_);
-    const int result = inner().rename(fromDirectory, from, toDirectory, to, flags);
-    if (result != 0)
-        return result;
+    TRY(inner().rename(fromDirectory, from, toDirectory, to, flags));
     const Place source = place(fromDirectory, from);
     const Place destination = place(toDirectory, to);
     if (source.directory == 0 && destination.directory == 0)
-        return result;
+        return Errno();
     const InodeId moved = source.directory == 0 ? 0 : findEntry(source.directory, source.name);
     if (moved == 0 || destination.directory == 0) {
         complaint_ += std::string("a move of \"") + from + "\" from or to where nothing is recorded; ";
-        return result;
+        return Errno();
     }
     add({.call = DiskCall::rename,
          .inode = moved,
@@ -259,13 +253,13 @@ int RecordingDisk::rename(int fromDirectory, const char* from, int toDirectory, 
          .toName = destination.name,
          .replaced = findEntry(destination.directory, destination.name),
          .exchanges = (flags & RENAME_EXCHANGE) != 0});
-    return result;
+    return Errno();
 }
 
-int RecordingDisk::setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) {
+Errno RecordingDisk::setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) {
     const MutexLock lock(mutex_);
-    const int result = inner().setAttribute(fd, name, value);
-    const InodeId id = result == 0 ? find(fd) : 0;
+    const Errno result = inner().setAttribute(fd, name, value);
+    const InodeId id = result ? 0 : find(fd);
     if (id == 0)
         return result;
     LoggedOperation operation{.call = DiskCall::setAttribute, .inode = id};
@@ -275,22 +269,22 @@ int RecordingDisk::setAttribute(int fd, const char* name, std::span<const std::u
     return result;
 }
 
-int RecordingDisk::write(int fd, std::span<const std::uint8_t> bytes) {
+Errno RecordingDisk::write(int fd, std::span<const std::uint8_t> bytes) {
     const MutexLock lock(mutex_);
     const std::uint64_t offset = writeOffset(fd);
-    const int result = inner().write(fd, bytes);
+    const Errno result = inner().write(fd, bytes);
     const auto end = static_cast<std::uint64_t>(::lseek(fd, 0, SEEK_CUR));
-    const std::size_t written = result == 0 ? bytes.size() : static_cast<std::size_t>(end - std::min(end, offset));
+    const std::size_t written = result ? static_cast<std::size_t>(end - std::min(end, offset)) : bytes.size();
     addData(fd, offset, Bytes(bytes.begin(), bytes.begin() + static_cast<std::ptrdiff_t>(written)));
     return result;
 }
 
-ssize_t RecordingDisk::copyData(int from, int to, std::size_t bytesMax) {
+ErrnoOr<std::size_t> RecordingDisk::copyData(int from, int to, std::size_t bytesMax) {
     const MutexLock lock(mutex_);
     const auto source = static_cast<std::uint64_t>(::lseek(from, 0, SEEK_CUR));
     const std::uint64_t offset = writeOffset(to);
-    const ssize_t count = inner().copyData(from, to, bytesMax);
-    Bytes bytes(static_cast<std::size_t>(std::max<ssize_t>(count, 0)));
+    const auto count = inner().copyData(from, to, bytesMax);
+    Bytes bytes(count.value_or(0));
     if (::pread(from, bytes.data(), bytes.size(), static_cast<off_t>(source)) != std::ssize(bytes))
         complaint_ += "a copy's source changed meanwhile; ";
     addData(to, offset, std::move(bytes));

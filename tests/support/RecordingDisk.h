@@ -8,6 +8,7 @@
 #pragma once
 
 #include "base/Mutex.h"
+#include "platform/Errno.h"
 #include "support/FileTree.h"
 #include "support/InterceptedDisk.h"
 
@@ -70,14 +71,14 @@ public:
     /// the one on disk. Empty when there are none.
     [[nodiscard]] std::string complaint() const;
 
-    int makeHardLink(int fromDirectory, const char* from, int toDirectory, const char* to) override;
-    int rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) override;
-    int setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) override;
-    int write(int fd, std::span<const std::uint8_t> bytes) override;
-    ssize_t copyData(int from, int to, std::size_t bytesMax) override;
+    Errno makeHardLink(int fromDirectory, const char* from, int toDirectory, const char* to) override;
+    Errno rename(int fromDirectory, const char* from, int toDirectory, const char* to, unsigned flags) override;
+    Errno setAttribute(int fd, const char* name, std::span<const std::uint8_t> value) override;
+    Errno write(int fd, std::span<const std::uint8_t> bytes) override;
+    ErrnoOr<std::size_t> copyData(int from, int to, std::size_t bytesMax) override;
 
 protected:
-    ssize_t intercept(const DiskCallInfo& info, const Make& make) override;
+    Errno intercept(const DiskCallInfo& info, const Make& make) override;
 
 private:
     /// 0 when the inode is not recorded.

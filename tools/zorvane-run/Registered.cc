@@ -93,9 +93,10 @@ Result<WantedContainers> chooseContainers(const Options& options) {
     auto applicationGroups =
         TRY(choose(*application, options.applicationGroups, "application", "--app-group", options));
     auto systemGroups = TRY(choose(*system, options.systemGroups, "system", "--system-group", options));
+    const bool systemContainer = TRY(chooseSystemContainer(*client, options));
     return WantedContainers{.applicationGroups = std::move(applicationGroups),
                             .systemGroups = std::move(systemGroups),
-                            .systemContainer = TRY(chooseSystemContainer(*client, options))};
+                            .systemContainer = systemContainer};
 }
 
 } // namespace zorvanerun

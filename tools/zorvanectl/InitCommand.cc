@@ -115,21 +115,21 @@ Outcome<void> Maker::makeDirectory(const std::string& path, mode_t mode, uid_t o
     if (!parent)
         return cannot("open " + root_.path(above), parent.error());
     const std::string name = path.substr(slash == path.npos ? 0 : slash + 1);
-    const int made = disk_.makeDirectory(parent->get(), name.c_str(), mode);
-    if (made != 0 && made != -EEXIST)
-        return cannot("make " + shown, Errno(-made));
+    const Errno made = disk_.makeDirectory(parent->get(), name.c_str(), mode);
+    if (made && made != EEXIST)
+        return cannot("make " + shown, made);
     const auto directory = openBeneath(parent->get(), name.c_str(), O_RDONLY | O_DIRECTORY);
     if (!directory)
         return cannot("open " + shown, directory.error());
-    if (made != 0)
+    if (made)
         return {};
-    int failed = disk_.changeMode(directory->get(), mode);
-    if (failed == 0 && owner != ::geteuid())
+    Errno failed = disk_.changeMode(directory->get(), mode);
+    if (!failed && owner != ::geteuid())
         failed = disk_.changeOwner(directory->get(), owner, owner);
-    if (failed == 0)
+    if (!failed)
         failed = disk_.sync(parent->get());
-    if (failed != 0)
-        return cannot("give " + shown + " its owner and mode", Errno(-failed));
+    if (failed)
+        return cannot("give " + shown + " its owner and mode", failed);
     made_.push_back("made " + shown);
     return {};
 }
@@ -139,10 +139,10 @@ Outcome<void> Maker::makeFile(const std::string& directory, const std::string& n
     if (!opened)
         return cannot("open " + root_.path(directory), opened.error());
     const std::string shown = root_.path(directory + "/" + name);
-    if (const int failed =
+    if (const Errno failed =
             zor::fs::replaceFileDurably(disk_, opened->get(), name, fileMode,
                                         {reinterpret_cast<const std::uint8_t*>(content.data()), content.size()}))
-        return cannot("write " + shown, Errno(-failed));
+        return cannot("write " + shown, failed);
     made_.push_back("wrote " + shown);
     return {};
 }
@@ -258,9 +258,8 @@ Outcome<void> Maker::make(const std::string& account) {
 /// The root, made where its parent is there.
 Outcome<zor::platform::SystemRoot> openRoot(const std::string& directory) {
     zor::platform::LinuxDisk disk;
-    if (const int failed = disk.makeDirectory(AT_FDCWD, directory.c_str(), directoryMode);
-        failed != 0 && failed != -EEXIST)
-        return cannot("make the root " + directory, Errno(-failed));
+    if (const Errno failed = disk.makeDirectory(AT_FDCWD, directory.c_str(), directoryMode); failed && failed != EEXIST)
+        return cannot("make the root " + directory, failed);
     auto root = zor::platform::SystemRoot::open(directory);
     if (!root)
         return cannot("open the root " + directory, root.error());

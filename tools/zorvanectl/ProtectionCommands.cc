@@ -55,7 +55,7 @@ content::Outcome<std::map<std::string, std::string>> classesOnDisk(const std::st
     const std::unique_ptr<DIR, int (*)(DIR*)> entries(::fdopendir(fd), ::closedir);
     if (!entries) {
         ::close(fd);
-        return content::failed("the container " + printable(path) + " cannot be read", ENOMEM);
+        return content::failed("the container " + printable(path) + " cannot be read", Errno(ENOMEM));
     }
     while (const dirent* entry = ::readdir(entries.get())) {
         if (entry->d_name[0] == '.')

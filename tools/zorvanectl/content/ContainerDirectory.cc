@@ -24,20 +24,17 @@ std::string placeOf(const std::string& path) {
     return end == std::string::npos ? std::string() : path.substr(0, end);
 }
 
-std::unexpected<Failure> notOpened(const std::string& path, int error) {
+std::unexpected<Failure> notOpened(const std::string& path, zor::Errno error) {
     const std::string cannot = "the container " + zorvane::printable(path) + " cannot be opened";
-    switch (error) {
-    case EXDEV:
+    if (error == EXDEV)
         return failed(cannot + ": somebody has mounted a file system on the way to it; unmount that ('findmnt' shows "
                                "where)");
-    case EHOSTDOWN:
+    if (error == EHOSTDOWN)
         return failed(cannot + ": the file system that " + zorvane::printable(placeOf(path)) +
                       " lies on does not answer; unmount what is mounted there, or bring its server back");
-    case ELOOP:
+    if (error == ELOOP)
         return failed(cannot + ": there is a symbolic link on the way to it; put the directory back in its place");
-    default:
-        return failed(cannot, error);
-    }
+    return failed(cannot, error);
 }
 
 } // namespace
@@ -45,13 +42,13 @@ std::unexpected<Failure> notOpened(const std::string& path, int error) {
 Outcome<FileDescriptor> openToldContainer(const std::string& path, MountFence::Kind kind) {
     const std::string place = placeOf(path);
     if (!path.starts_with('/') || place.empty())
-        return notOpened(path, EINVAL);
+        return notOpened(path, zor::Errno(EINVAL));
     const FileDescriptor root(::open("/", O_PATH | O_DIRECTORY | O_CLOEXEC));
     if (!root.valid())
-        return notOpened(path, errno);
+        return notOpened(path, zor::Errno::last());
     auto container = MountFence(root.get(), place.substr(1), kind).open(path.c_str() + 1, O_RDONLY | O_DIRECTORY);
     if (!container)
-        return notOpened(path, container.error().number());
+        return notOpened(path, container.error());
     return std::move(*container);
 }
 

@@ -59,15 +59,15 @@ public:
             .admit = [this](const zor::fs::WalkEntry& entry, int item,
                             const char* target) { return admit(entry, item, target); },
             .copied = [this](std::uint64_t bytes) { return answer(course_.addBytes(bytes)); },
-            .failed = [this](const zor::fs::WalkEntry& entry, int error) { fail(entry, error); }};
-        const int result = zor::fs::copyContent(disk, source.get(), sealed.get(), rules);
-        if (result == 0)
+            .failed = [this](const zor::fs::WalkEntry& entry, zor::Errno error) { fail(entry, error); }};
+        const zor::Errno error = zor::fs::copyContent(disk, source.get(), sealed.get(), rules);
+        if (!error)
             return {};
-        return failure_ ? std::unexpected(*failure_) : failed("the source cannot be copied", -result);
+        return failure_ ? std::unexpected(*failure_) : failed("the source cannot be copied", error);
     }
 
 private:
-    int admit(const zor::fs::WalkEntry& entry, int item, const char* target) {
+    zor::Errno admit(const zor::fs::WalkEntry& entry, int item, const char* target) {
         if (entry.status.st_dev == container_.st_dev && entry.status.st_ino == container_.st_ino)
             return answer(refused("the source holds the container itself"));
         const std::string name = entry.path();
@@ -81,21 +81,21 @@ private:
         return answer(course_.addItem());
     }
 
-    int answer(const Outcome<void>& outcome) {
+    zor::Errno answer(const Outcome<void>& outcome) {
         if (outcome)
-            return 0;
+            return zor::Errno();
         failure_ = outcome.error();
-        return -ECANCELED;
+        return zor::Errno(ECANCELED);
     }
 
-    void fail(const zor::fs::WalkEntry& entry, int error) {
+    void fail(const zor::fs::WalkEntry& entry, zor::Errno error) {
         if (failure_)
             return;
         const std::string name = entry.depth == 0 ? "the source" : zorvane::printable(entry.path());
         if (entry.onOtherFileSystem)
             failure_ = refused(name + " lies on another file system than the source").error();
         else
-            failure_ = failed(name + " cannot be copied", -error).error();
+            failure_ = failed(name + " cannot be copied", error).error();
     }
 
     const struct stat& container_;
@@ -111,7 +111,7 @@ Outcome<Source> Source::open(const std::string& path) {
     source.file_ = TRY(openForInstallation(path, source.holders_));
     struct stat status{};
     if (::fstat(source.file_.get(), &status) != 0)
-        return failed(zorvane::printable(path) + " cannot be opened", errno);
+        return failed(zorvane::printable(path) + " cannot be opened", zor::Errno::last());
     if (!S_ISDIR(status.st_mode) && !S_ISREG(status.st_mode))
         return failed(zorvane::printable(path) + " is neither a directory nor a file");
     source.isDirectory_ = S_ISDIR(status.st_mode);
@@ -127,14 +127,14 @@ Outcome<Source> Source::ofStandardInput() {
     Source source;
     source.file_.reset(::open(place, O_TMPFILE | O_RDWR | O_CLOEXEC, mode));
     if (!source.file_.valid())
-        return failed(std::string("an archive from standard input cannot be kept in ") + place, errno);
+        return failed(std::string("an archive from standard input cannot be kept in ") + place, zor::Errno::last());
     std::vector<char> buffer(std::size_t{1} << 20);
     for (;;) {
         const ssize_t count = ::read(STDIN_FILENO, buffer.data(), buffer.size());
         if (count < 0 && errno == EINTR)
             continue;
         if (count < 0)
-            return failed("standard input cannot be read", errno);
+            return failed("standard input cannot be read", zor::Errno::last());
         if (count == 0)
             break;
         for (ssize_t done = 0; done < count;) {
@@ -143,7 +143,8 @@ Outcome<Source> Source::ofStandardInput() {
             if (written < 0 && errno == EINTR)
                 continue;
             if (written <= 0)
-                return failed(std::string("an archive from standard input cannot be kept in ") + place, errno);
+                return failed(std::string("an archive from standard input cannot be kept in ") + place,
+                              zor::Errno::last());
             done += written;
         }
         source.bytes_ += static_cast<std::uint64_t>(count);
@@ -151,7 +152,7 @@ Outcome<Source> Source::ofStandardInput() {
     if (source.bytes_ == 0)
         return failed("standard input is empty, and no archive");
     if (::lseek(source.file_.get(), 0, SEEK_SET) != 0)
-        return failed("the archive cannot be read from its beginning", errno);
+        return failed("the archive cannot be read from its beginning", zor::Errno::last());
     return source;
 }
 
@@ -159,7 +160,7 @@ Outcome<Progress> putContent(zor::platform::Disk& disk, int container, const Sou
                              const volatile std::sig_atomic_t& stop) {
     struct stat status{};
     if (::fstat(container, &status) != 0)
-        return failed("the container cannot be examined", errno);
+        return failed("the container cannot be examined", zor::Errno::last());
     const auto report = [&](Phase phase, const Progress& progress) {
         if (observer.progressed)
             observer.progressed(phase, progress);
@@ -179,8 +180,8 @@ Outcome<Progress> putContent(zor::platform::Disk& disk, int container, const Sou
         done = sealed.raise();
     report(Phase::syncing, course.progress());
     if (done)
-        if (const int synced = disk.syncFileSystem(container); synced < 0)
-            done = failed("the content cannot be brought to the disk", -synced);
+        if (const zor::Errno error = disk.syncFileSystem(container))
+            done = failed("the content cannot be brought to the disk", error);
     if (done)
         done = course.checkStopped();
     TRY(std::move(done));

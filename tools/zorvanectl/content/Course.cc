@@ -47,7 +47,7 @@ Outcome<void> Course::checkRoom() {
     itemsAtCheck_ = progress_.items;
     struct statvfs status{};
     if (::fstatvfs(place_, &status) != 0)
-        return failed("the store's file system cannot be examined", errno);
+        return failed("the store's file system cannot be examined", zor::Errno::last());
     const std::uint64_t unit = status.f_frsize;
     const std::uint64_t available = status.f_bavail * unit;
     const std::uint64_t reserve = std::min(reserveBytesMax, status.f_blocks * unit / reserveShare);

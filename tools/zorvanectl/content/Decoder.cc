@@ -221,7 +221,7 @@ bool keepOnly(int archive, int records) {
 Outcome<Decoder> Decoder::start(int archive) {
     int ends[2];
     if (::pipe2(ends, O_CLOEXEC) != 0)
-        return failed("no pipe", errno);
+        return failed("no pipe", zor::Errno::last());
     zor::platform::FileDescriptor reading(ends[0]);
     const zor::platform::FileDescriptor writing(ends[1]);
     // A larger one saves switches; where it is not granted, the usual one does.
@@ -230,7 +230,7 @@ Outcome<Decoder> Decoder::start(int archive) {
     std::fflush(nullptr);
     const pid_t pid = ::fork();
     if (pid < 0)
-        return failed("no process to decode in", errno);
+        return failed("no process to decode in", zor::Errno::last());
     if (pid == 0)
         decode(archive, writing.get(), parent);
     return Decoder(pid, std::move(reading));

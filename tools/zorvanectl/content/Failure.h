@@ -2,6 +2,8 @@
 // Why content cannot be put into a container: one sentence for people.
 #pragma once
 
+#include "platform/Errno.h"
+
 #include <expected>
 #include <string>
 
@@ -17,8 +19,8 @@ struct Failure {
 template <typename T>
 using Outcome = std::expected<T, Failure>;
 
-/// "WHAT: what the errno means".
-[[nodiscard]] std::unexpected<Failure> failed(const std::string& what, int number);
+/// "WHAT: what the error means".
+[[nodiscard]] std::unexpected<Failure> failed(const std::string& what, zor::Errno error);
 [[nodiscard]] std::unexpected<Failure> failed(std::string what);
 /// The source of an installation is not taken as it is.
 [[nodiscard]] std::unexpected<Failure> refused(std::string what);

@@ -37,7 +37,7 @@ public:
 
     Outcome<FileDescriptor> open() {
         if (path_.empty())
-            return cannotOpen(ENOENT);
+            return cannotOpen(zor::Errno(ENOENT));
         rest_ = path_;
         TRY(begin());
         for (;;) {
@@ -47,7 +47,7 @@ public:
             const FileDescriptor place(::openat(directory_.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
             struct stat status{};
             if (!place.valid() || ::fstat(place.get(), &status) != 0)
-                return cannotOpen(errno);
+                return cannotOpen(zor::Errno::last());
             if (S_ISLNK(status.st_mode))
                 TRY(follow(name, place, status));
             else if (rest_.empty())
@@ -58,7 +58,7 @@ public:
     }
 
 private:
-    [[nodiscard]] std::unexpected<Failure> cannotOpen(int error) const {
+    [[nodiscard]] std::unexpected<Failure> cannotOpen(zor::Errno error) const {
         return failed(zorvane::printable(path_) + " cannot be opened", error);
     }
     [[nodiscard]] std::unexpected<Failure> refused(const std::string& why) const {
@@ -79,7 +79,7 @@ private:
     Outcome<void> enterAt(int parent, const char* name) {
         FileDescriptor next(::openat(parent, name, O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
         if (!next.valid() || ::fstat(next.get(), &directoryStatus_) != 0)
-            return cannotOpen(errno);
+            return cannotOpen(zor::Errno::last());
         directory_ = std::move(next);
         holders_.addToTheWay(directoryStatus_);
         return {};
@@ -92,7 +92,7 @@ private:
         char target[PATH_MAX];
         const ssize_t length = ::readlinkat(link.get(), "", target, sizeof target);
         if (length < 0 || ++links_ > linksMax)
-            return cannotOpen(length < 0 ? errno : ELOOP);
+            return cannotOpen(length < 0 ? zor::Errno::last() : zor::Errno(ELOOP));
         rest_.insert(0, target, static_cast<std::size_t>(length));
         return rest_.starts_with('/') ? begin() : Outcome<void>();
     }
@@ -103,7 +103,7 @@ private:
         FileDescriptor last(::openat(directory_.get(), name.c_str(), flags));
         struct stat status{};
         if (!last.valid() || ::fstat(last.get(), &status) != 0)
-            return cannotOpen(errno);
+            return cannotOpen(zor::Errno::last());
         if (!S_ISDIR(status.st_mode) && !isTrusted(status.st_uid) && status.st_uid != directoryStatus_.st_uid)
             return refused("it belongs to user " + std::to_string(status.st_uid) +
                            ", and the directory that holds it to user " + std::to_string(directoryStatus_.st_uid));

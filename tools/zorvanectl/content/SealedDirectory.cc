@@ -31,15 +31,15 @@ Outcome<SealedDirectory> SealedDirectory::make(zor::platform::Disk& disk, int co
     // Not to be guessed: nothing of the source can have this name.
     std::uint64_t random = 0;
     if (::getrandom(&random, sizeof random, 0) != static_cast<ssize_t>(sizeof random))
-        return failed("no random number", errno);
+        return failed("no random number", zor::Errno::last());
     std::array<char, 32> name{};
     std::snprintf(name.data(), name.size(), ".install-%016llx", static_cast<unsigned long long>(random));
     sealed.name_ = name.data();
-    if (const int made = disk.makeDirectory(container, name.data(), 0700); made < 0)
-        return failed("the container cannot be written to", -made);
+    if (const zor::Errno error = disk.makeDirectory(container, name.data(), 0700))
+        return failed("the container cannot be written to", error);
     auto directory = zor::platform::openBeneathOnMount(container, name.data(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!directory)
-        return failed("the new content's directory cannot be opened", directory.error().number());
+        return failed("the new content's directory cannot be opened", directory.error());
     if (!zor::fs::isFreshDirectory(directory->get()))
         return failed("somebody put something else in the place of the new content's directory");
     sealed.directory_ = std::move(*directory);
@@ -51,33 +51,33 @@ Outcome<void> SealedDirectory::raise() {
     for (bool found = true; found;) {
         found = false;
         BulkDirectoryRead entries(directory_.get(), *buffer);
-        if (const int begun = entries.seek(0); begun < 0)
-            return failed("the new content cannot be listed", -begun);
+        if (const zor::Errno error = entries.seek(0))
+            return failed("the new content cannot be listed", error);
         while (const BulkDirectoryRead::Entry* entry = entries.next()) {
             found = true;
             if (auto raised = raiseItem(entry->name); !raised)
                 return raised;
         }
-        if (entries.error() != 0)
+        if (entries.error())
             return failed("the new content cannot be listed", entries.error());
     }
     // An empty directory stays where its owner moved it meanwhile.
-    if (const int removed = disk_->removeDirectory(container_, name_.c_str()); removed < 0 && removed != -ENOENT)
-        return failed("the new content's directory cannot be removed", -removed);
+    if (const zor::Errno error = disk_->removeDirectory(container_, name_.c_str()); error && error != ENOENT)
+        return failed("the new content's directory cannot be removed", error);
     return {};
 }
 
 Outcome<void> SealedDirectory::raiseItem(const char* name) {
     const std::string shown = zorvane::printable(name);
     for (int attempt = 0;; ++attempt) {
-        const int raised = disk_->rename(directory_.get(), name, container_, name, RENAME_NOREPLACE);
-        if (raised == 0)
+        const zor::Errno raised = disk_->rename(directory_.get(), name, container_, name, RENAME_NOREPLACE);
+        if (!raised)
             return {};
-        if (raised != -EEXIST || attempt == attemptsMax)
-            return failed(shown + " cannot be moved into the container", -raised);
+        if (raised != EEXIST || attempt == attemptsMax)
+            return failed(shown + " cannot be moved into the container", raised);
         // A standard subdirectory, or what the container's owner put there.
-        if (const int removed = zor::fs::removeTree(*disk_, container_, name); removed < 0 && removed != -ENOENT)
-            return failed("the container's own " + shown + " cannot be removed", -removed);
+        if (const zor::Errno error = zor::fs::removeTree(*disk_, container_, name); error && error != ENOENT)
+            return failed("the container's own " + shown + " cannot be removed", error);
     }
 }
 

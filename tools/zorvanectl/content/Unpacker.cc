@@ -83,7 +83,7 @@ Outcome<void> Unpacker::fill(int records, std::size_t bytes) {
         if (count < 0 && errno == EINTR)
             continue;
         if (count < 0)
-            return failed("the archive's decoder cannot be read", errno);
+            return failed("the archive's decoder cannot be read", zor::Errno::last());
         if (count == 0)
             return content::refused(
                 "the archive's decoder ended too early: the archive asks for too much, or breaks it");
@@ -142,7 +142,7 @@ Outcome<Unpacker::Place> Unpacker::placeOf(const std::string& name) {
             opened = openBeneathOnMount(directory_, parent.c_str(), flags);
         }
         if (!opened)
-            return cannotMake(opened.error().number());
+            return cannotMake(opened.error());
         parent_ = std::move(*opened);
         parentPath_ = parent;
     }
@@ -158,39 +158,36 @@ Outcome<void> Unpacker::makeParents(const std::string& path) {
         const int parent = current.valid() ? current.get() : directory_;
         auto below = openBeneathOnMount(parent, name.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
         if (!below && below.error() == ENOENT) {
-            if (auto made = makeDirectory(parent, name, impliedDirectoryMode); !made)
-                return made;
-            if (auto counted = course_.addItem(); !counted)
-                return counted;
+            TRY(makeDirectory(parent, name, impliedDirectoryMode));
+            TRY(course_.addItem());
             below = openBeneathOnMount(parent, name.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
         }
         if (!below)
-            return cannotMake(below.error().number());
+            return cannotMake(below.error());
         current = std::move(*below);
     }
     return {};
 }
 
 Outcome<void> Unpacker::makeDirectory(int parent, const std::string& name, mode_t mode) {
-    const int made = disk_.makeDirectory(parent, name.c_str(), 0700);
-    if (made < 0 && made != -EEXIST)
-        return cannotMake(-made);
+    if (const zor::Errno error = disk_.makeDirectory(parent, name.c_str(), 0700); error && error != EEXIST)
+        return cannotMake(error);
     const auto directory = openBeneathOnMount(parent, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!directory)
-        return cannotMake(directory.error() == ENOTDIR || directory.error() == ELOOP ? EEXIST
-                                                                                     : directory.error().number());
-    if (const int owned = disk_.changeOwner(directory->get(), owner_.user, owner_.group); owned < 0)
-        return cannotMake(-owned);
-    if (const int moded = disk_.changeMode(directory->get(), mode); moded < 0)
-        return cannotMake(-moded);
+        return cannotMake(directory.error() == ENOTDIR || directory.error() == ELOOP ? zor::Errno(EEXIST)
+                                                                                     : directory.error());
+    if (const zor::Errno error = disk_.changeOwner(directory->get(), owner_.user, owner_.group))
+        return cannotMake(error);
+    if (const zor::Errno error = disk_.changeMode(directory->get(), mode))
+        return cannotMake(error);
     return {};
 }
 
 Outcome<void> Unpacker::makeFile(const Place& place) {
-    FileDescriptor file(disk_.createFile(place.directory, place.name.c_str(), 0600));
-    if (!file.valid())
-        return cannotMake(-file.get());
-    file_ = std::move(file);
+    auto file = disk_.createFile(place.directory, place.name.c_str(), 0600);
+    if (!file)
+        return cannotMake(file.error());
+    file_ = std::move(*file);
     fileEnd_ = 0;
     return {};
 }
@@ -203,9 +200,9 @@ Outcome<void> Unpacker::writeData(const Record& record, std::span<const std::uin
     if (record.offset < fileEnd_ || record.offset > std::numeric_limits<std::int64_t>::max() - record.first)
         return refused(entry_.name, "its data is out of order");
     if (record.offset > fileEnd_ && ::lseek(file_.get(), record.offset, SEEK_SET) < 0)
-        return cannotMake(errno);
-    if (const int written = disk_.write(file_.get(), bytes); written < 0)
-        return cannotMake(-written);
+        return cannotMake(zor::Errno::last());
+    if (const zor::Errno error = disk_.write(file_.get(), bytes))
+        return cannotMake(error);
     fileEnd_ = record.offset + static_cast<std::int64_t>(bytes.size());
     return course_.addBytes(bytes.size());
 }
@@ -222,32 +219,31 @@ Outcome<void> Unpacker::finishFile() {
         // It ends with a hole; its last byte gives it its length.
         constexpr std::array<std::uint8_t, 1> zero{};
         if (::lseek(file.get(), record.offset - 1, SEEK_SET) < 0)
-            return cannotMake(errno);
-        if (const int written = disk_.write(file.get(), zero); written < 0)
-            return cannotMake(-written);
+            return cannotMake(zor::Errno::last());
+        if (const zor::Errno error = disk_.write(file.get(), zero))
+            return cannotMake(error);
     }
-    if (const int owned = disk_.changeOwner(file.get(), owner_.user, owner_.group); owned < 0)
-        return cannotMake(-owned);
-    if (const int moded = disk_.changeMode(file.get(), static_cast<mode_t>(record.mode) & accessBits); moded < 0)
-        return cannotMake(-moded);
+    if (const zor::Errno error = disk_.changeOwner(file.get(), owner_.user, owner_.group))
+        return cannotMake(error);
+    if (const zor::Errno error = disk_.changeMode(file.get(), static_cast<mode_t>(record.mode) & accessBits))
+        return cannotMake(error);
     if ((record.flags & recordHasTime) == 0)
         return {};
     const timespec time{.tv_sec = record.timeSeconds,
                         .tv_nsec = static_cast<long>(std::min<std::uint32_t>(record.timeNanoseconds, 999'999'999))};
-    if (const int timed = disk_.setTimes(file.get(), time, time); timed < 0)
-        return cannotMake(-timed);
+    if (const zor::Errno error = disk_.setTimes(file.get(), time, time))
+        return cannotMake(error);
     return {};
 }
 
 Outcome<void> Unpacker::makeSymbolicLink(const Place& place) {
-    const int made = disk_.makeSymbolicLink(entry_.target.c_str(), place.directory, place.name.c_str());
-    if (made < 0)
-        return cannotMake(-made);
+    if (const zor::Errno error = disk_.makeSymbolicLink(entry_.target.c_str(), place.directory, place.name.c_str()))
+        return cannotMake(error);
     const FileDescriptor link(::openat(place.directory, place.name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
     if (!link.valid())
-        return cannotMake(errno);
-    const int owned = disk_.changeOwner(link.get(), owner_.user, owner_.group);
-    return owned < 0 ? cannotMake(-owned) : Outcome<void>();
+        return cannotMake(zor::Errno::last());
+    const zor::Errno error = disk_.changeOwner(link.get(), owner_.user, owner_.group);
+    return error ? cannotMake(error) : Outcome<void>();
 }
 
 Outcome<void> Unpacker::makeHardLink(const Place& place) {
@@ -262,9 +258,9 @@ Outcome<void> Unpacker::makeHardLink(const Place& place) {
     if (!directory || ::fstatat(directory->get(), name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0 ||
         !S_ISREG(status.st_mode))
         return refused(entry_.name, "a hard link to what is no file earlier in the archive");
-    const int linked = disk_.makeHardLink(directory->get(), name.c_str(), place.directory, place.name.c_str());
-    if (linked < 0)
-        return cannotMake(-linked);
+    if (const zor::Errno error =
+            disk_.makeHardLink(directory->get(), name.c_str(), place.directory, place.name.c_str()))
+        return cannotMake(error);
     const bool hasData = (entry_.record.flags & recordHasSize) != 0 && entry_.record.offset > 0;
     if (!hasData)
         return {};
@@ -273,22 +269,18 @@ Outcome<void> Unpacker::makeHardLink(const Place& place) {
         return refused(entry_.name, "the data of its file comes twice");
     auto file = openBeneathOnMount(place.directory, place.name.c_str(), O_WRONLY | O_NOFOLLOW);
     if (!file)
-        return cannotMake(file.error().number());
+        return cannotMake(file.error());
     file_ = std::move(*file);
     fileEnd_ = 0;
     return {};
 }
 
-std::unexpected<Failure> Unpacker::cannotMake(int number) const {
-    switch (number) {
-    case EEXIST:
+std::unexpected<Failure> Unpacker::cannotMake(zor::Errno error) const {
+    if (error == EEXIST)
         return refused(entry_.name, "it comes twice");
-    case ENOTDIR:
-    case ELOOP:
+    if (error == ENOTDIR || error == ELOOP)
         return refused(entry_.name, "it lies below something that is no directory");
-    default:
-        return failed(zorvane::printable(entry_.name) + " cannot be written", number);
-    }
+    return failed(zorvane::printable(entry_.name) + " cannot be written", error);
 }
 
 } // namespace zorvanectl::content

@@ -14,6 +14,7 @@
 #include "Failure.h"
 #include "os/FileDescriptor.h"
 #include "platform/Disk.h"
+#include "platform/Errno.h"
 
 #include <cstdint>
 #include <span>
@@ -62,7 +63,7 @@ private:
     [[nodiscard]] Outcome<void> makeSymbolicLink(const Place& place);
     [[nodiscard]] Outcome<void> makeHardLink(const Place& place);
     /// The meaning of an errno for the entry that is being made.
-    [[nodiscard]] std::unexpected<Failure> cannotMake(int number) const;
+    [[nodiscard]] std::unexpected<Failure> cannotMake(zor::Errno error) const;
 
     zor::platform::Disk& disk_;
     const int directory_;
