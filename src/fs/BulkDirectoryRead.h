@@ -35,7 +35,7 @@ public:
 
     /// The next entry, or nullptr at the end and after an error.
     const Entry* next();
-    /// Of the read that ended the entries.
+    /// The error of the read that ended the entries.
     [[nodiscard]] Errno error() const { return error_; }
     /// The place at which the entry after the last one given begins. Good for seek(), on this or another descriptor of
     /// the same directory.

@@ -62,7 +62,7 @@ std::string joined(const std::string& path, const char* name) {
     return path.empty() ? std::string(name) : path + '/' + name;
 }
 
-/// What the threads of a measurement share.
+/// The state that the threads of a measurement share.
 struct Tree {
     Tree(int rootOpened, const std::string& path, const UsageLog& usageLog)
         : root(rootOpened), rootPath(path), log(usageLog), traits(traitsOf(rootOpened)) {}

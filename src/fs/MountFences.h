@@ -7,8 +7,8 @@
 // mount. That of a home is judged whenever it is another than before: a file system that a user serves (FUSE) is no
 // home, EXDEV; one that is not of this machine may stop answering. Such a home is asked on a thread of its own whether
 // it still answers, at most once in `answerHoldsMilliseconds`, and while it does not, all that leads there fails
-// with EHOSTDOWN at once. Who is about to take a lock that others need asks anew. Not defended: a home that stops
-// answering between the question and the use holds the thread that is there.
+// with EHOSTDOWN at once. A caller that is about to take a lock that others need asks anew. Not defended: a home that
+// stops answering between the question and the use holds the thread that is there.
 //
 // Changes nothing on the disk. Any thread; fences are added, never taken away.
 #pragma once

@@ -43,8 +43,8 @@ struct ContentRules {
     uid_t owner = 0;
     gid_t group = 0;
     /// Asked about each item before it is copied, with the status of what will be: `item` is the open file or
-    /// directory, -1 for all else and where none could be opened. Of a symbolic link with its target. An error ends the
-    /// copy.
+    /// directory, -1 for all else and where none could be opened. A symbolic link comes with its target. An error ends
+    /// the copy.
     std::function<Errno(const WalkEntry& entry, int item, const char* linkTarget)> admit;
     /// Told of each piece of a file that was copied; the same.
     std::function<Errno(std::uint64_t bytes)> copied;

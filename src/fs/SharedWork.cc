@@ -33,7 +33,7 @@ long waitsOfThisThread() {
     return ::getrusage(RUSAGE_THREAD, &usage) == 0 ? usage.ru_nvcsw : 0;
 }
 
-/// What answers requests runs before others. A helper is for large work, and must not keep those back.
+/// Threads that answer requests run before others. A helper is for large work, and must not keep those back.
 void giveUpHigherPriority() {
     const auto thread = static_cast<id_t>(::gettid());
     if (::getpriority(PRIO_PROCESS, thread) < 0)

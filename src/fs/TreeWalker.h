@@ -5,7 +5,7 @@
 // open; a name that is gone when its turn comes counts as never having been there; a name that became something else is
 // visited as what it is now. A directory is visited before and after its content. A mount point, or a subvolume, is
 // visited before and after but not entered, and nothing of what lies on it is asked; that holds for the root of the
-// walk too, unless it is ".". Where only types are wanted, a mount on a file is shown as the file.
+// walk too, unless it is ".". A mount on a file is shown as the file where only types are wanted.
 //
 // Any depth and any width: fewer than DirectoryStack::openMax + 8 descriptors, no recursion, and memory that grows with
 // the length of the current path alone. A directory whose descriptor had to be closed is found again by ".." and must
@@ -111,8 +111,8 @@ private:
 // Tells, in one walk of a tree, whether a file that has several names has one outside: when all its names have been
 // met, it has none.
 //
-// What is counted are meetings. Whoever can rename in the tree during the walk can have one name met twice, so who asks
-// sees to it that nobody can, or that nobody gains by it. Memory grows with the files of which names are still to come.
+// Meetings are counted. Whoever can rename in the tree during the walk can have one name met twice, so who asks sees to
+// it that nobody can, or that nobody gains by it. Memory grows with the files of which names are still to come.
 
 class NamesMet {
 public:

@@ -121,8 +121,8 @@ public:
     /// The entries whose names do not begin with ".", in the directory's order. ENOKEY where an encryption hides them.
     Result<std::vector<FileURL>> urlsForItemsInDirectoryAtURL(const FileURL& directory);
     /// The same, each to the visitor as it is read, so that no directory is too large for the memory; with a false
-    /// answer it is the last. The visitor gets the open directory too, and may remove the entry. What copies across
-    /// file systems left hidden is shown where it is asked for.
+    /// answer it is the last. The visitor gets the open directory too, and may remove the entry. The items that copies
+    /// across file systems left hidden are shown where they are asked for.
     enum class Leftovers { hidden, shown };
     using ItemVisitor = std::function<bool(int directory, const FileURL& item)>;
     Result<void> forEachItemInDirectoryAtURL(const FileURL& directory, Leftovers leftovers, const ItemVisitor& visitor);
@@ -153,9 +153,9 @@ public:
     /// `predicate` gets the current class and says whether to set; without one, always.
     Result<void> setDataProtectionClassOfItemAtURL(const FileURL& url, int protectionClass,
                                                    const std::function<bool(int)>& predicate = nullptr);
-    /// The same for a directory or regular file that a walk has met; `path` names it in messages. What is opened
-    /// counts, and `predicate` gets its status too: what is of another kind by now is left alone, as if it had gone
-    /// before. EPERM means that the device is locked, and nothing else.
+    /// The same for a directory or regular file that a walk has met; `path` names it in messages. The item that is
+    /// opened counts, and `predicate` gets its status too: an item of another kind by now is left alone, as if it had
+    /// gone before. EPERM means that the device is locked, and nothing else.
     Result<void>
     setDataProtectionClassOfEntry(const fs::WalkEntry& entry, const std::string& path, int protectionClass,
                                   const std::function<bool(const struct stat& status, int current)>& predicate);

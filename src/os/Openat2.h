@@ -21,8 +21,8 @@ namespace zor::platform {
 /// added). A link anywhere gives ELOOP (with O_PATH | O_NOFOLLOW a link in the last place too), a step out EXDEV.
 [[nodiscard]] ErrnoOr<FileDescriptor> openBeneath(int directory, const char* relativePath, int flags, mode_t mode = 0);
 
-/// The same, and no mount point is crossed, not even one of the same file system: EXDEV. What is mounted there is not
-/// asked. A ".." is refused even where it stays inside.
+/// The same, and no mount point is crossed, not even one of the same file system: EXDEV. The file system that is
+/// mounted there is not asked. A ".." is refused even where it stays inside.
 [[nodiscard]] ErrnoOr<FileDescriptor> openBeneathOnMount(int directory, const char* relativePath, int flags);
 
 /// The same as openBeneath with O_PATH, out of the kernel's memory of names alone: no file system is asked, so none can
