@@ -3,9 +3,9 @@
 """The rules of the house that no compiler knows, as a part of ./dev lint.
 
 Calls that pass by the layer that owns them, includes that go up (the table is docs/architecture.md's), circles of headers,
-standard headers that are used and not included, sources without a head, checks that were silenced, and a page of threats that
-names tests which do not exist. Prints one line for each fault and ends with 1. Before it judges the tree it breaks each rule
-once and ends with 2 where that stays unseen.
+standard headers that are used and not included, sources without a head, sentences that come late to their subject, checks that
+were silenced, and a page of threats that names tests which do not exist. Prints one line for each fault and ends with 1. Before
+it judges the tree it breaks each rule once and ends with 2 where that stays unseen.
 """
 import re
 import sys
@@ -58,11 +58,11 @@ STANDARD = {header: re.compile(rf"(?<![\w:])std::{names}(?!\w)") for header, nam
 TOKEN = re.compile(r'R"([^(\s]*)\((?:.|\n)*?\)\1"|//[^\n]*|/\*(?:.|\n)*?\*/|"(?:\\.|[^"\\\n])*"|(?<!\w)\'(?:\\.|[^\'\\\n])*\'')
 
 
-def code_of(text, keep_literals=False):
-    """The text with its comments, and its literals if they are not kept, blanked; lines keep their numbers."""
+def code_of(text, keep_literals=False, keep_comments=False):
+    """The text with its comments and its literals blanked, where they are not kept; lines keep their numbers."""
     def blank(match):
         token = match[0]
-        return token if keep_literals and token[0] != "/" else re.sub(r"[^\n]", " ", token)
+        return token if (keep_comments if token[0] == "/" else keep_literals) else re.sub(r"[^\n]", " ", token)
     return TOKEN.sub(blank, text)
 
 
@@ -86,6 +86,18 @@ def call_faults(path, text):
 
 def text_faults(path, text):
     return [f"{path}:{line}: use {instead}" for pattern, instead in TEXTS for line in lines_with(re.compile(pattern), text)]
+
+
+def sentence_faults(path, text):
+    """Strangers read comments: the noun that a sentence is about opens it."""
+    faults, before = [], "."
+    for number, line in enumerate(code_of(text, keep_comments=True).splitlines(), 1):
+        code, _, comment = line.partition("//")
+        words = comment.strip("/< ")
+        opened = re.findall(r"(?<=[.:?!] )(?:What|Who|Where|Of)\b", ("." if code.strip() else before[-1]) + " " + words)
+        faults += [f"{path}:{number}: a sentence opens with {word}; name its subject first" for word in opened]
+        before = "." if code.strip() or not words else words
+    return faults
 
 
 def head_faults(path, text, has_header):
@@ -188,6 +200,8 @@ def blind_rules():
         "texts that only look like it": not text_faults("a", "NO" + "LINTNEXTLINE(bugprone-x)\n"),
         "heads": [len(head_faults("src/A.h", text, False)) for text in
                   (head + "#pragma once\n", head, "#pragma once\n", head + "#pragma once\n" * 600)] == [0, 1, 2, 1],
+        "sentences": len(sentence_faults("a", "// What a.\n//\n// Of b. Who\n// c.\n// Where d.\nf();  // Of e\n")) == 5,
+        "sentences that only look like it": not sentence_faults("a", '// Says\n// Who: of A.\nf("// Of b"); // what\nWhat c;\n'),
         "includes": len(include_faults(rules, pairs)) == 4,
         "standard headers": len(standard_faults({"src/low/A.cc": '#include "low/A.h"\nstd::map<int, std::string> a;\n',
                                                 "src/low/A.h": "#include <map>\n", "src/top/B.h": "Astd::map a; // std::map\n"})) == 1,
@@ -217,6 +231,8 @@ def main():
         faults += call_faults(path, text)
     for path, text in sources.items():
         faults += head_faults(path, text, path[:-3] + ".h" in sources or path.endswith("Test.cc"))
+    for path, text in (sources | below(code, (".hpp",))).items():
+        faults += sentence_faults(path, text)
     everything = code + ("docs", "packaging", "cmake", "dev", ".ci/run", "CMakeLists.txt", "README.md", "CHANGELOG.md",
                          "CONTRIBUTING.md", "SECURITY.md")
     endings = (".h", ".cc", ".py", ".md", ".txt", ".cmake", ".sh", ".service", ".socket", ".in", ".1", ".3", ".5", ".8", "dev", "run")
