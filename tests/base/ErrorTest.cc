@@ -44,7 +44,7 @@ TEST(Error, NumberIsPositiveAndHandedOn) {
     const auto value = [](int number) { return number == 0 ? ErrnoOr<int>(7) : Errno(number); };
     const auto number = [&](int failure) -> Errno { return Errno(TRY(value(failure)) - 7); };
     const auto word = [&](int failure) -> ErrnoOr<std::string> { return std::to_string(TRY(value(failure))); };
-    EXPECT_TRUE(!number(0) && number(ENOENT) == ENOENT && word(0) == "7" && word(EIO).error() == EIO);
+    EXPECT_TRUE(!number(0) && number(ENOENT) == ENOENT && word(0).value() == "7" && word(EIO).error() == EIO);
     EXPECT_DEATH((void)Errno(-ENOENT), "");
 }
 
