@@ -3,16 +3,13 @@
 
 #include "base/Try.h"
 #include "fs/ItemStatus.h"
-#include "fs/SharedWork.h"
 #include "fs/TreeWalker.h"
 #include "os/Openat2.h"
 
 #include <algorithm>
 #include <cerrno>
-#include <dirent.h>
 #include <fcntl.h>
 #include <linux/fs.h>
-#include <memory>
 #include <sys/ioctl.h>
 #include <sys/stat.h>
 
@@ -23,9 +20,6 @@ namespace {
 /// How often a directory is read again because names came into it, and a root that changes its kind is tried again.
 constexpr unsigned passesMax = 64;
 
-/// A second thread costs more than it brings for a tree of fewer entries.
-constexpr std::uint64_t entriesForTwoThreads = 512;
-
 /// Whether one of `unwanted` was set and all of them are cleared.
 ErrnoOr<bool> clearInodeFlags(platform::Disk& disk, int fd, int unwanted) {
     int flags = 0;
@@ -35,39 +29,6 @@ ErrnoOr<bool> clearInodeFlags(platform::Disk& disk, int fd, int unwanted) {
         return false;
     TRY(disk.setInodeFlags(fd, flags & ~unwanted));
     return true;
-}
-
-/// Takes the files out of the directories of a tree, on two threads at once. Whatever does not go at the first attempt
-/// stays, and so do the directories: who removes the tree afterwards meets them, and says why something cannot go.
-void emptyTogether(platform::Disk& disk, int parent, const char* name) {
-    constexpr int flags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW;
-    const auto root = platform::openBeneathOnMount(parent, name, flags);
-    struct stat top{};
-    if (!root || ::fstat(root->get(), &top) != 0)
-        return;
-    DirectoryQueue waiting;
-    const auto empty = [&](const std::string& path, BulkDirectoryRead::Buffer& buffer) {
-        const auto directory = platform::openBeneathOnMount(root->get(), path.empty() ? "." : path.c_str(), flags);
-        struct stat status{};
-        // A part of another file system can lie here without a mount point.
-        if (!directory || ::fstat(directory->get(), &status) != 0 || status.st_dev != top.st_dev)
-            return;
-        BulkDirectoryRead entries(directory->get(), buffer);
-        while (const BulkDirectoryRead::Entry* entry = entries.next()) {
-            if (entry->type == DT_DIR)
-                (void)waiting.add(path.empty() ? std::string(entry->name) : path + '/' + entry->name);
-            else if (entry->type != DT_UNKNOWN)
-                (void)disk.unlinkFile(directory->get(), entry->name);
-        }
-    };
-    const std::function<void()> share = [&] {
-        const auto buffer = std::make_unique<BulkDirectoryRead::Buffer>();
-        waiting.workOff([&](const std::string& path) { empty(path, *buffer); });
-    };
-    Helpers helpers(1);
-    helpers.add(share);
-    helpers.run(share);
-    helpers.finish();
 }
 
 class Remover {
@@ -88,9 +49,6 @@ private:
 
     platform::Disk& disk_;
     const RemoveCallbacks& callbacks_;
-    int parent_ = -1;
-    const char* name_ = nullptr;
-    std::uint64_t entries_ = 0;
     /// Why the root has to be looked at once more.
     Errno rootChanged_;
     /// The root is not what is to be removed.
@@ -100,8 +58,6 @@ private:
 };
 
 Errno Remover::remove(int directory, const char* name) {
-    parent_ = directory;
-    name_ = name;
     TreeWalker walker(WalkStatus::typeOnly);
     const TreeWalker::Visitor visitor = [this](const WalkEntry& entry) { return visit(entry); };
     for (unsigned pass = 1;; ++pass) {
@@ -125,9 +81,6 @@ Errno Remover::remove(int directory, const char* name) {
 WalkStep Remover::visit(const WalkEntry& entry) {
     if (callbacks_.goOn && !callbacks_.goOn())
         return WalkStep::stop;
-    // Only one thread can ask whether to go on.
-    if (!callbacks_.goOn && ++entries_ == entriesForTwoThreads)
-        emptyTogether(disk_, parent_, name_);
     switch (entry.kind) {
     case WalkEntryKind::directory:
         anotherMet_ =

@@ -4,8 +4,9 @@
 // Works inside trees that others own and change meanwhile: links are removed, never followed; what lies on another file
 // system is left (its mount point then cannot be removed: EBUSY); a name that is gone is as good as removed; names that
 // are added meanwhile are removed too, within a limit. Any depth and width, see fs/TreeWalker.h. Nothing outside the
-// tree is touched: the directory that holds the root only loses the root's name. A second thread shares the files of a
-// large tree; nothing else is left to it, so that its failures are met again and told in order.
+// tree is touched: the directory that holds the root only loses the root's name.
+//
+// One thread: a second one showed no gain, and would be one more way into a tree that its owner changes.
 //
 // An interruption leaves a smaller tree under the root's name. Nothing is synced. Any thread.
 #pragma once
