@@ -7,6 +7,8 @@
 #include "process/DaemonProcess.h"
 #include "support/FakeServer.h"
 
+#include <gtest/gtest.h>
+
 namespace zor::whole {
 
 /// The fate of a request: it reaches the daemon; nothing comes for ten seconds, or until the client goes, and then

@@ -1,6 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "process/UnitFences.h"
 
+#include "support/Sanitized.h"
+
 #include <algorithm>
 #include <cerrno>
 #include <cstddef>
@@ -15,12 +17,6 @@
 namespace zor::whole {
 
 namespace {
-
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-constexpr bool isSanitized = true;
-#else
-constexpr bool isSanitized = false;
-#endif
 
 std::vector<unsigned> numbersIn(std::istream& lines) {
     std::string line;
@@ -39,7 +35,7 @@ UnitFences::UnitFences() {
     capabilities_ = numbersIn(lines);
     const auto passed = numbersIn(lines);
     const auto refused = numbersIn(lines);
-    if (isSanitized || passed.empty())
+    if (support::isSanitized || passed.empty())
         return;
     filter_.push_back(BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)));
     const auto answer = [&](const std::vector<unsigned>& calls, std::uint32_t action) {
@@ -56,7 +52,7 @@ UnitFences::UnitFences() {
 
 bool UnitFences::enter() {
     constexpr rlimit nice{.rlim_cur = 25, .rlim_max = 25}; // the unit's LimitNICE=-5
-    if (::geteuid() == 0 && !isSanitized) {
+    if (::geteuid() == 0 && !support::isSanitized) {
         (void)::setrlimit(RLIMIT_NICE, &nice); // where there is no power for it, priorities stay as they are
         for (unsigned number = 0; ::prctl(PR_CAPBSET_READ, number, 0, 0, 0) >= 0; ++number)
             if (std::ranges::find(capabilities_, number) == capabilities_.end() &&

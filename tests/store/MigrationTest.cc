@@ -3,6 +3,7 @@
 #include "daemon/Daemon.h"
 #include "world/World.h"
 
+#include <atomic>
 #include <gtest/gtest.h>
 #include <stdexcept>
 #include <unistd.h>
@@ -64,8 +65,8 @@ TEST(Migration, StopsAtTheNextItem) {
         }
         int stops = 0;
         for (int allowed = 0; !world.bootMarker.state.present; ++allowed) {
-            int looks = 0;
-            int behind = 0;
+            std::atomic<int> looks{0}; // the death row's thread asks the disk, too
+            std::atomic<int> behind{0};
             world.restart();
             world.disk().arm({.filter = [&](const support::DiskCallInfo&) {
                 behind += looks > allowed ? 1 : 0;

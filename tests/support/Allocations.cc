@@ -1,21 +1,14 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "support/Allocations.h"
 
+#include "support/Sanitized.h"
+
 #include <algorithm>
 #include <atomic>
 #include <cstdlib>
 #include <limits>
 #include <malloc.h>
 #include <new>
-
-#ifdef __has_feature
-#if __has_feature(thread_sanitizer) || __has_feature(address_sanitizer)
-#define ZOR_OPERATOR_NEW_IS_TAKEN
-#endif
-#endif
-#if defined(__SANITIZE_THREAD__) || defined(__SANITIZE_ADDRESS__)
-#define ZOR_OPERATOR_NEW_IS_TAKEN
-#endif
 
 namespace {
 
@@ -28,7 +21,7 @@ thread_local std::ptrdiff_t peakOfLive = 0;
 
 } // namespace
 
-#ifndef ZOR_OPERATOR_NEW_IS_TAKEN
+#ifndef ZOR_IS_SANITIZED
 
 void* operator new(std::size_t size) {
     const bool refused = size >= bytesRefusedFrom.load(std::memory_order_relaxed) || allocationsLeft == 0;
@@ -59,7 +52,7 @@ void operator delete(void* memory, std::size_t) noexcept {
 namespace zor::support {
 
 bool allocationsCanFail() {
-#ifdef ZOR_OPERATOR_NEW_IS_TAKEN
+#ifdef ZOR_IS_SANITIZED
     return false;
 #else
     return true;

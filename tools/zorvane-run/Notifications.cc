@@ -65,12 +65,14 @@ Result<Notifications> Notifications::ofCaller() {
         return made;
     sockaddr_un address{};
     socklen_t length = 0;
-    made.own_ = datagrams();
-    made.manager_ = datagrams();
-    zor::Errno error =
-        made.own_.valid() && made.manager_.valid() ? addressOf(name, address, length) : zor::Errno::last();
-    if (!error && ::connect(made.manager_.get(), reinterpret_cast<const sockaddr*>(&address), length) != 0)
-        error = zor::Errno::last();
+    zor::Errno error = addressOf(name, address, length);
+    if (!error) {
+        made.own_ = datagrams();
+        made.manager_ = datagrams();
+        if (!made.own_.valid() || !made.manager_.valid() ||
+            ::connect(made.manager_.get(), reinterpret_cast<const sockaddr*>(&address), length) != 0)
+            error = zor::Errno::last();
+    }
     if (error)
         return std::unexpected(Failure{
             .what = withReason("the service manager's socket " + std::string(name) + " cannot be reached", error),

@@ -86,7 +86,7 @@ std::string padded(const std::string& text, std::size_t columns) {
 }
 
 constexpr std::size_t gap = 2;
-constexpr std::size_t indent = 4;
+constexpr std::size_t continuationIndent = 4;
 
 /// The cells of a row, on as many lines as the terminal's width makes of them; without a terminal, on one.
 std::string rowOf(const std::vector<std::string>& cells, const std::vector<std::size_t>& widths, std::size_t columns) {
@@ -95,10 +95,11 @@ std::string rowOf(const std::vector<std::string>& cells, const std::vector<std::
     for (std::size_t column = 0; column < cells.size(); ++column) {
         const bool isLast = column + 1 == cells.size();
         const std::size_t width = std::max(widths[column], columnsOf(cells[column]));
-        if (columns != 0 && taken > indent && taken + (isLast ? columnsOf(cells[column]) : width) > columns) {
+        if (columns != 0 && taken > continuationIndent &&
+            taken + (isLast ? columnsOf(cells[column]) : width) > columns) {
             text.erase(text.find_last_not_of(' ') + 1);
-            text += "\n" + std::string(indent, ' ');
-            taken = indent;
+            text += "\n" + std::string(continuationIndent, ' ');
+            taken = continuationIndent;
         }
         text += isLast ? cells[column] : padded(cells[column], width + gap);
         taken += width + gap;
