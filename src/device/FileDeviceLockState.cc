@@ -45,11 +45,6 @@ int parseState(std::string_view text) {
 
 } // namespace
 
-bool FileDeviceLockState::Known::isOf(const struct stat& status) const {
-    return device == status.st_dev && inode == status.st_ino && bytes == status.st_size &&
-           changed.tv_sec == status.st_ctim.tv_sec && changed.tv_nsec == status.st_ctim.tv_nsec;
-}
-
 int FileDeviceLockState::currentState() const {
     if (const auto state = keptState())
         return *state;
@@ -85,7 +80,7 @@ ErrnoOr<int> FileDeviceLockState::look() const {
         return Errno::last();
     {
         const MutexLock held(mutex_);
-        if (known_ && known_->isOf(status))
+        if (known_ && known_->stamp == stampOf(status))
             return known_->state;
     }
     return readState();
@@ -105,11 +100,7 @@ ErrnoOr<int> FileDeviceLockState::readState() const {
     const MutexLock held(mutex_);
     known_.reset();
     if (examined && status.st_ctim.tv_sec + settledSeconds < now.tv_sec)
-        known_ = {.device = status.st_dev,
-                  .inode = status.st_ino,
-                  .bytes = status.st_size,
-                  .changed = status.st_ctim,
-                  .state = state};
+        known_ = {.stamp = stampOf(status), .state = state};
     return state;
 }
 

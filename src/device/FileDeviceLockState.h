@@ -14,6 +14,7 @@
 
 #include "base/Mutex.h"
 #include "os/FileDescriptor.h"
+#include "os/FileStamp.h"
 #include "os/RunLoop.h"
 #include "os/SystemRoot.h"
 #include "platform/Device.h"
@@ -22,7 +23,6 @@
 #include <atomic>
 #include <cstdint>
 #include <optional>
-#include <sys/stat.h>
 
 namespace zor::platform {
 
@@ -40,13 +40,8 @@ public:
 private:
     /// The state that a file holds, and by what it is known again.
     struct Known {
-        dev_t device;
-        ino_t inode;
-        off_t bytes;
-        timespec changed;
+        FileStamp stamp;
         int state;
-
-        [[nodiscard]] bool isOf(const struct stat& status) const;
     };
     /// The state that the last look gave, for as long as nothing can have changed since.
     struct Kept {

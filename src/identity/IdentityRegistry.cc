@@ -163,7 +163,7 @@ std::vector<IdentityRegistry::Registered> IdentityRegistry::readEntries(const Re
 bool IdentityRegistry::isBeingWritten(const std::string& name, const FileStamp& stamp) const {
     timespec now{};
     ::clock_gettime(CLOCK_REALTIME, &now);
-    const std::int64_t age = std::int64_t{now.tv_sec} * 1'000'000'000 + now.tv_nsec - stamp.changedNanoseconds;
+    const std::int64_t age = nanosecondsOf(now) - stamp.changedNanoseconds;
     return age < writingNanosecondsMax && watches_.isBeingWritten(name);
 }
 

@@ -31,15 +31,16 @@ struct FileCloser {
     void operator()(std::FILE* file) const { std::fclose(file); }
 };
 
-std::int64_t nanoseconds(const timespec& time) {
-    return std::int64_t{time.tv_sec} * nanosecondsPerSecond + time.tv_nsec;
-}
-
 bool isSettled(std::int64_t changedNanoseconds) {
     timespec now{};
     ::clock_gettime(CLOCK_REALTIME_COARSE, &now);
     const bool wholeSeconds = changedNanoseconds % nanosecondsPerSecond == 0;
-    return nanoseconds(now) - changedNanoseconds > (wholeSeconds ? 2 * nanosecondsPerSecond : tickNanosecondsMax);
+    return nanosecondsOf(now) - changedNanoseconds > (wholeSeconds ? 2 * nanosecondsPerSecond : tickNanosecondsMax);
+}
+
+ErrnoOr<FileStamp> stampOfOpen(int file) {
+    struct stat status{};
+    return ::fstat(file, &status) == 0 ? ErrnoOr<FileStamp>(stampOf(status)) : Errno::last();
 }
 
 PasswordEntry named(const passwd& found) {
@@ -95,20 +96,9 @@ ErrnoOr<PasswordEntry> LinuxPasswordDatabase::entryForName(std::string_view name
                   [this](PasswordEntry found) { return entryOf(std::move(found)); });
 }
 
-ErrnoOr<LinuxPasswordDatabase::Stamp> LinuxPasswordDatabase::stampOf(int file) {
-    struct stat status{};
-    if (::fstat(file, &status) != 0)
-        return Errno::last();
-    return Stamp{.device = status.st_dev,
-                 .inode = status.st_ino,
-                 .bytes = status.st_size,
-                 .modifiedNanoseconds = nanoseconds(status.st_mtim),
-                 .changedNanoseconds = nanoseconds(status.st_ctim)};
-}
-
 ErrnoOr<PasswordEntry> LinuxPasswordDatabase::findInFile(const Matches& matches) const {
     FileDescriptor opened = TRY(openInRoot(root_.descriptor(), names::passwordFile, O_RDONLY | O_NONBLOCK));
-    const Stamp stamp = TRY(stampOf(opened.get()));
+    const FileStamp stamp = TRY(stampOfOpen(opened.get()));
     std::shared_ptr<const Content> content;
     {
         const MutexLock held(mutex_);
@@ -129,7 +119,7 @@ ErrnoOr<PasswordEntry> LinuxPasswordDatabase::findInFile(const Matches& matches)
             read->entries.push_back(std::move(entry));
             return keeps;
         });
-        const auto after = stampOf(descriptor);
+        const auto after = stampOfOpen(descriptor);
         if (keeps && settled && end == ENOENT && after && *after == stamp) {
             const MutexLock held(mutex_);
             content_ = read;

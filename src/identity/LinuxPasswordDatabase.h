@@ -6,6 +6,7 @@
 #pragma once
 
 #include "base/Mutex.h"
+#include "os/FileStamp.h"
 #include "os/SystemRoot.h"
 #include "platform/Device.h"
 #include "platform/Errno.h"
@@ -13,7 +14,6 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
-#include <sys/types.h>
 #include <vector>
 
 namespace zor::platform {
@@ -25,23 +25,13 @@ public:
     [[nodiscard]] ErrnoOr<PasswordEntry> entryForName(std::string_view name) const override;
 
 private:
-    /// Tells one content of the file from another.
-    struct Stamp {
-        dev_t device = 0;
-        ino_t inode = 0;
-        off_t bytes = 0;
-        std::int64_t modifiedNanoseconds = 0;
-        std::int64_t changedNanoseconds = 0;
-        bool operator==(const Stamp&) const = default;
-    };
     /// The file as it was read; a home is as the file names it.
     struct Content {
-        Stamp stamp;
+        FileStamp stamp;
         std::vector<PasswordEntry> entries;
     };
     using Matches = std::function<bool(const PasswordEntry&)>;
 
-    [[nodiscard]] static ErrnoOr<Stamp> stampOf(int file);
     [[nodiscard]] ErrnoOr<PasswordEntry> findInFile(const Matches& matches) const ZOR_EXCLUDES(mutex_);
     /// `named`, with its home below the root; ENOENT when that is no absolute path.
     [[nodiscard]] ErrnoOr<PasswordEntry> entryOf(PasswordEntry named) const;

@@ -12,10 +12,6 @@ namespace zor::platform {
 
 namespace {
 
-std::int64_t nanosecondsOf(const timespec& time) {
-    return std::int64_t{time.tv_sec} * 1'000'000'000 + time.tv_nsec;
-}
-
 RegistryProblem cannot(const char* what, Errno error) {
     return {.text = std::string("cannot be ") + what + ": " + error.text(), .isShortage = isOwnShortage(error)};
 }
@@ -61,12 +57,7 @@ RegistryListing RegistryDirectory::list() const {
                                                       " files; the last ones do not count"};
             break;
         }
-        listing.files[std::move(name)] = {.id = {.device = status.st_dev, .inode = status.st_ino},
-                                          .mode = status.st_mode,
-                                          .uid = status.st_uid,
-                                          .bytes = status.st_size,
-                                          .modifiedNanoseconds = nanosecondsOf(status.st_mtim),
-                                          .changedNanoseconds = nanosecondsOf(status.st_ctim)};
+        listing.files[std::move(name)] = stampOf(status);
     }
     listing.directory = std::move(*opened);
     return listing;

@@ -7,6 +7,7 @@
 
 #include "identity/IdentityFile.h"
 #include "os/FileDescriptor.h"
+#include "os/FileStamp.h"
 #include "os/SystemRoot.h"
 
 #include <cstdint>
@@ -17,24 +18,6 @@
 #include <sys/stat.h>
 
 namespace zor::platform {
-
-/// The marks by which a file is the same one, whatever its name in whichever mount namespace.
-struct FileId {
-    dev_t device = 0;
-    ino_t inode = 0;
-    bool operator==(const FileId&) const = default;
-};
-
-/// Everything about a file that changes when it does.
-struct FileStamp {
-    FileId id;
-    mode_t mode = 0;
-    uid_t uid = 0;
-    off_t bytes = 0;
-    std::int64_t modifiedNanoseconds = 0;
-    std::int64_t changedNanoseconds = 0;
-    bool operator==(const FileStamp&) const = default;
-};
 
 /// Why something does not count.
 struct RegistryProblem {

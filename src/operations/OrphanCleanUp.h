@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Entries of a class directory that are no containers go to death row, at the first launch after a boot.
 //
-// Whoever owns a class directory can rename anything to a name in it. So only what belongs to the owner of its
+// The owner of a class directory can rename anything to a name in it. So only what belongs to the owner of its
 // containers goes; another's directory stays, and is said.
 //
 // Directories are read in batches: no number of entries is too large for the memory. Every step may be repeated. On the

@@ -17,7 +17,7 @@ namespace zor {
 using platform::FileDescriptor;
 
 Result<void> Replace::openDirectories(Progress& progress) {
-    // Whoever owns them may have put something else, or another's directory, in their places. Old and new one are of
+    // Their owner may have put something else, or another's directory, in their places. Old and new one are of
     // one class and user.
     const std::uint32_t owner =
         ZORGlobalConfiguration::ownerOfClassDirectory(progress.newRecord->containerClass(), progress.newRecord->uid());

@@ -176,7 +176,7 @@ Result<std::vector<FoundContainer>> ZORGroupManager::groupContainers(std::uint32
         const auto groups = type == GroupType::system
                                 ? needs_.entitlements.systemGroupIdentifiersForIdentifier(identifier)
                                 : needs_.entitlements.appGroupIdentifiersForIdentifier(identifier);
-        // Whoever may ask at all may ask for any identifier's: a path opens nothing, its directory has an owner.
+        // A client that may ask at all may ask for any identifier's: a path opens nothing, its directory has an owner.
         for (const std::string& group : groups.value_or(std::vector<std::string>())) {
             if (unavailable.contains(group))
                 continue;
