@@ -85,7 +85,8 @@ MountFence::MountFence(int root, std::string_view path, Kind kind)
 
 bool MountFence::holds(std::string_view path) const {
     const std::string& own = judgement_->path;
-    return path.starts_with(own) && (path.size() == own.size() || path[own.size()] == '/');
+    // The end first: it tells most fences from a path that they do not hold, without a look at the names.
+    return path.size() >= own.size() && (path.size() == own.size() || path[own.size()] == '/') && path.starts_with(own);
 }
 
 std::size_t MountFence::ownBytes(std::string_view path) const {
@@ -129,9 +130,8 @@ bool MountFence::answers(Asked asked) {
     bool isJudged = false;
     {
         const MutexLock held(judgement_->mutex);
-        const auto age = std::chrono::steady_clock::now() - judgement_->answeredAt;
         if (judgement_->kind == MountKind::local || judgement_->kind == MountKind::usersOwn ||
-            (asked == Asked::lately && age < homeAnswerHolds))
+            (asked == Asked::lately && std::chrono::steady_clock::now() - judgement_->answeredAt < homeAnswerHolds))
             return true;
         isJudged = judgement_->kind != MountKind::unknown;
         // The question may outlive this object, and whoever made it.

@@ -15,6 +15,9 @@ namespace zor::plist {
 
 namespace {
 
+/// Messages have no more.
+constexpr std::size_t fewEntries = 8;
+
 /// A number that is none equals itself here: what was stored compares equal to what was asked to be stored.
 bool sameNumber(double left, double right) {
     return left == right || (std::isnan(left) && std::isnan(right));
@@ -93,6 +96,13 @@ Dictionary::const_iterator Dictionary::end() const {
 }
 
 const Value* Dictionary::find(std::string_view key) const {
+    // Of a few keys most are told apart by their lengths, without a look at their bytes.
+    if (entries_.size() <= fewEntries) {
+        for (const Entry& entry : entries_)
+            if (entry.first == key)
+                return &entry.second;
+        return nullptr;
+    }
     const auto found = lowerBound(entries_.begin(), entries_.end(), key);
     return found != entries_.end() && found->first == key ? &found->second : nullptr;
 }

@@ -54,7 +54,7 @@ void ListenerConnection::open(PeerSocket socket, std::unique_ptr<Peer> peer, Lis
     {
         // Under the mutex to the end: an event that belongs to an earlier life may come at any moment.
         const MutexLock lock(mutex_);
-        input_.open(core_.charges, account, peer->pid());
+        input_.open(core_.charges, account, socket.get(), peer->pid());
         output_.open(core_.charges, account, core_.limits.outputBytesMax);
         account_ = &account;
         uid_ = peer->kernelUserId();
@@ -97,10 +97,11 @@ void ListenerConnection::run(ListenerScratch& scratch, std::uint32_t events) {
         held_ = true;
     }
     Outcome outcome = Outcome::wait;
-    Turn turn;
+    Turn turn{.onlyArrival = events == EPOLLIN};
     do {
         try {
             outcome = keepRest(serve(scratch, turn));
+            turn.onlyArrival = false;
             if (outcome == Outcome::requeue)
                 return core_.pool.requeue(*this);
         } catch (const std::exception&) {
@@ -112,27 +113,34 @@ void ListenerConnection::run(ListenerScratch& scratch, std::uint32_t events) {
         close();
 }
 
-void ListenerConnection::lookAtRoom() {
+bool ListenerConnection::lookAtRoom() {
     // Before the looks: what comes after them sets the mark again.
-    lookAgain_ = false;
+    const bool hasHappened = lookAgain_ && lookAgain_.exchange(false);
     if (output_.pendingBytes() == 0)
-        return;
+        return hasHappened;
     const MutexLock lock(mutex_);
     if (output_.flush(descriptor_) == ListenerOutput::Result::broken)
         dropLocked();
+    return hasHappened;
 }
 
 ListenerConnection::Outcome ListenerConnection::serve(ListenerScratch& scratch, Turn& turn) {
-    for (;;) {
-        lookAtRoom();
+    for (bool isLast = false;;) {
+        turn.onlyArrival = !lookAtRoom() && turn.onlyArrival;
         if (const std::optional<Outcome> outcome = serveArrived(scratch, turn))
             return *outcome;
+        if (isLast && turn.onlyArrival)
+            return Outcome::wait;
         if (output_.pendingBytes() >= core_.limits.outputBytesPaused)
             return Outcome::wait;
         if (turn.receives++ >= receivesPerTurn)
             return Outcome::requeue;
         switch (input_.receive(descriptor_, scratch)) {
         case ListenerInput::Received::bytes:
+            isLast = false;
+            break;
+        case ListenerInput::Received::lastBytes:
+            isLast = true;
             break;
         case ListenerInput::Received::nothing:
             return Outcome::wait;
@@ -221,8 +229,8 @@ std::shared_ptr<ListenerConnection::Channel> ListenerConnection::channelFor(std:
 std::uint32_t ListenerConnection::eventsWanted() const {
     const std::size_t pending = output_.pendingBytes();
     if (pending == 0)
-        return EPOLLIN | EPOLLET;
-    return pending < core_.limits.outputBytesPaused ? std::uint32_t{EPOLLIN | EPOLLOUT | EPOLLET}
+        return EPOLLIN | EPOLLRDHUP | EPOLLET;
+    return pending < core_.limits.outputBytesPaused ? std::uint32_t{EPOLLIN | EPOLLRDHUP | EPOLLOUT | EPOLLET}
                                                     : std::uint32_t{EPOLLOUT | EPOLLET};
 }
 

@@ -5,7 +5,9 @@
 // The kernel tells each arrival once. The worker that takes the event *holds* the connection until the kernel has
 // nothing more for it (also while it is requeued): it reads, serves and closes; nobody else does. An event that another
 // worker takes meanwhile is left to the holder, who looks again before it lets go. That bytes came short of what there
-// was room for tells nothing: those of another sender may wait behind them, and no event comes for those any more.
+// was room for tells nothing: those of another sender may wait behind them, and no event comes for those any more. So
+// the holder receives until it finds nothing, unless its event told of an arrival alone and the kernel says, with the
+// bytes, that none wait behind them: an end of the stream that is no news any more was in the event.
 //
 // Replies may be sent by any thread at any time. While some are unsent, the connection waits for room as well: the
 // holder sees to that when it lets go, and with no holder the thread that sent.
@@ -67,12 +69,14 @@ private:
     struct Turn {
         unsigned frames = 0;
         unsigned receives = 0;
+        /// Nothing but an arrival was told, so all else is still to come with an event.
+        bool onlyArrival = false;
         /// Looked at when a second frame is at hand: most turns have one, and need no clock.
         std::chrono::steady_clock::time_point firstServed;
     };
 
-    /// Sends on of what is kept, as far as there is room, and forgets what has happened before.
-    void lookAtRoom() ZOR_EXCLUDES(mutex_);
+    /// Sends on of what is kept, as far as there is room, and forgets what has happened before: whether anything has.
+    bool lookAtRoom() ZOR_EXCLUDES(mutex_);
     Outcome serve(ListenerScratch& scratch, Turn& turn);
     [[nodiscard]] bool isOver(Turn& turn) const;
     /// Keeps what has arrived of the next request, whatever the worker's scratch buffer is used for meanwhile.

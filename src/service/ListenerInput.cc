@@ -4,7 +4,9 @@
 #include "ipc/Frame.h"
 
 #include <algorithm>
+#include <bit>
 #include <cerrno>
+#include <cstdint>
 #include <cstring>
 #include <sys/socket.h>
 #include <sys/uio.h>
@@ -14,10 +16,20 @@ namespace zor::platform {
 
 namespace {
 
-/// Room for the sender's credentials and nothing else: descriptors that a peer sends along do not fit, and the kernel
-/// closes them without making them ours, in this thread (PassedAlong.h).
+// Older headers do not have it; nor do kernels before 6.17, which then say nothing.
+#ifdef SO_INQ
+constexpr int tellWaiting = SO_INQ;
+#else
+constexpr int tellWaiting = 84;
+#endif
+/// The kernel's count of the bytes that wait behind those received is a number of four bytes, of which only the first
+/// are taken: in the place of all four a descriptor of a peer's would fit.
+constexpr std::size_t waitingBytesTaken = sizeof(std::uint32_t) - 1;
+
+/// Room for the sender's credentials, the beginning of that count and nothing else: descriptors that a peer sends along
+/// do not fit, and the kernel closes them without making them ours, in this thread (PassedAlong.h).
 struct ControlBuffer {
-    alignas(cmsghdr) char bytes[CMSG_SPACE(sizeof(ucred))];
+    alignas(cmsghdr) char bytes[CMSG_SPACE(sizeof(ucred)) + CMSG_LEN(waitingBytesTaken)];
 };
 
 /// 0 when the kernel does not say, or cannot (another pid namespace).
@@ -31,9 +43,26 @@ pid_t senderOf(msghdr& message) {
     return credentials.pid;
 }
 
+/// Whether the kernel says, behind the credentials, that nothing waits. A queue of just so many bytes that only the
+/// last one of the count tells them (16 MiB) is beyond what a socket may hold; who gets there has to send more to be
+/// read on.
+bool nothingWaits(const msghdr& message, const ControlBuffer& buffer) {
+    constexpr std::size_t at = CMSG_SPACE(sizeof(ucred));
+    cmsghdr control = {};
+    if (std::endian::native != std::endian::little || message.msg_controllen < sizeof buffer.bytes)
+        return false;
+    std::memcpy(&control, buffer.bytes + at, sizeof control);
+    const char* const count = buffer.bytes + at + CMSG_LEN(0);
+    return control.cmsg_level == SOL_SOCKET && control.cmsg_type == tellWaiting &&
+           std::all_of(count, count + waitingBytesTaken, [](char byte) { return byte == 0; });
+}
+
 } // namespace
 
-void ListenerInput::open(ListenerCharges& charges, ListenerCharges::Account& account, pid_t peerPid) {
+void ListenerInput::open(ListenerCharges& charges, ListenerCharges::Account& account, int socket, pid_t peerPid) {
+    // Without it a receive that finds nothing tells the same.
+    const int on = 1;
+    (void)::setsockopt(socket, SOL_SOCKET, tellWaiting, &on, sizeof on);
     charges_ = &charges;
     account_ = &account;
     peerPid_ = peerPid;
@@ -153,7 +182,7 @@ ListenerInput::Received ListenerInput::receive(int socket, ListenerScratch& scra
     const std::size_t toKept = std::min(count, room->kept);
     keptEnd_ += toKept;
     inScratch_ = {scratch.bytes.get(), inScratch_.size() + count - toKept};
-    return Received::bytes;
+    return nothingWaits(message, control) ? Received::lastBytes : Received::bytes;
 }
 
 } // namespace zor::platform

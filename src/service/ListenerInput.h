@@ -25,12 +25,14 @@ public:
     ListenerInput(const ListenerInput&) = delete;
     ListenerInput& operator=(const ListenerInput&) = delete;
 
-    void open(ListenerCharges& charges, ListenerCharges::Account& account, pid_t peerPid);
+    void open(ListenerCharges& charges, ListenerCharges::Account& account, int socket, pid_t peerPid);
     /// Gives the buffer and its charge back.
     void close();
 
     enum class Received {
         bytes,
+        /// Bytes, and the kernel says that nobody's wait behind them: what comes after is told by an event of its own.
+        lastBytes,
         /// Nothing has arrived.
         nothing,
         /// The stream has ended or broken.

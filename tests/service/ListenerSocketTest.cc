@@ -301,6 +301,31 @@ TEST(PassedAlong, ToAnotherProcessIsNotThePeer) {
         }
 }
 
+// Goal: an event that came for several things at once is served to its end. Method: they wait before anybody reads,
+// behind bytes at which a receive stops.
+TEST(PassedAlong, WhatWaitsBehindItIsNotForgotten) {
+    const auto sendFromAnother = [](RawClient& client) {
+        const pid_t child = ::fork();
+        if (child == 0)
+            ::_exit(client.send(numbered(2), 2) ? 0 : 1);
+        ::waitpid(child, nullptr, 0);
+    };
+    const std::pair<const char*, std::function<void(RawClient&)>> rows[] = {
+        {"a request", [](RawClient& client) { EXPECT_TRUE(client.send(numbered(2), 2)); }},
+        {"the end", [](RawClient& client) { ::shutdown(client.socket(), SHUT_WR); }},
+        {"another's request", sendFromAnother},
+    };
+    for (const auto& [what, act] : rows) {
+        SCOPED_TRACE(what);
+        EarlyClients early(1);
+        RawClient& client = early.clients[0];
+        act(client);
+        const Listening listening(early, {.threadsRunning = 1, .threadsMax = 1});
+        EXPECT_TRUE(client.receives(1, numbered(1)));
+        EXPECT_TRUE(&act == &rows[0].second ? client.receives(2, numbered(2)) : client.ended());
+    }
+}
+
 /// A port that is served on a thread of its own. Each reply is text: the packet's length, the sender's pid and uid.
 class ServedPort {
 public:
