@@ -6,7 +6,7 @@
 #include "Report.h"
 #include "Statistics.h"
 #include "fs/Names.h"
-#include "plist/Binary.h"
+#include "plist/Codec.h"
 #include "store/ZORMetadata.h"
 
 #include <array>

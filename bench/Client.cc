@@ -4,7 +4,7 @@
 #include "Processes.h"
 #include "Statistics.h"
 #include "ipc/Frame.h"
-#include "plist/Binary.h"
+#include "plist/Codec.h"
 
 #include <algorithm>
 #include <cerrno>

@@ -4,8 +4,7 @@
 #pragma once
 
 #include "base/ContainerClass.h"
-#include "base/UserIdentity.h"
-#include "ipc/Keys.h"
+#include "ipc/Protocol.h"
 #include "os/FileDescriptor.h"
 #include "plist/Value.h"
 

@@ -1,10 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Daemon.h"
 
-#include "base/EntitlementKeys.h"
-#include "ipc/Names.h"
-#include "os/Names.h"
-#include "plist/Binary.h"
+#include "ipc/Protocol.h"
+#include "os/SystemRoot.h"
+#include "platform/Service.h"
+#include "plist/Codec.h"
 
 #include <cerrno>
 #include <csignal>

@@ -3,7 +3,7 @@
 #include "Benchmarks.h"
 #include "ContentTree.h"
 
-#include "base/EntitlementKeys.h"
+#include "platform/Service.h"
 
 #include <filesystem>
 

@@ -5,7 +5,7 @@
 #include "ContentTree.h"
 #include "TreeFloor.h"
 
-#include "ipc/Names.h"
+#include "ipc/Protocol.h"
 
 #include <fcntl.h>
 #include <fstream>

@@ -4,8 +4,8 @@
 #include "Benchmarks.h"
 #include "RoundTripPairs.h"
 
-#include "base/EntitlementKeys.h"
-#include "ipc/Keys.h"
+#include "ipc/Protocol.h"
+#include "platform/Service.h"
 #include "store/Names.h"
 #include "store/ZOREntitlementMapping.h"
 

@@ -3,7 +3,7 @@
 // the same mounts and namespaces.
 #include "Benchmarks.h"
 
-#include "ipc/Keys.h"
+#include "ipc/Protocol.h"
 #include "store/ZOREntitlementMapping.h"
 
 #include <array>

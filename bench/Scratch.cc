@@ -3,7 +3,7 @@
 
 #include "Processes.h"
 #include "Report.h"
-#include "device/SemaphoreBootMarker.h"
+#include "device/DeviceQueries.h"
 
 #include <cerrno>
 #include <fcntl.h>

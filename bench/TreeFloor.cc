@@ -6,8 +6,8 @@
 #include "Report.h"
 #include "Statistics.h"
 #include "fs/Names.h"
-#include "os/Names.h"
-#include "plist/Binary.h"
+#include "os/SystemRoot.h"
+#include "plist/Codec.h"
 #include "store/ZORMetadata.h"
 
 #include <cerrno>

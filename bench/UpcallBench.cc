@@ -3,10 +3,10 @@
 // whether the containers exist; and what a thousand upcalls a second do to a client's lookups beside them.
 #include "Benchmarks.h"
 #include "RoundTripPairs.h"
-#include "base/EntitlementKeys.h"
-#include "ipc/Names.h"
-#include "os/Names.h"
-#include "plist/Binary.h"
+#include "ipc/Protocol.h"
+#include "os/SystemRoot.h"
+#include "platform/Service.h"
+#include "plist/Codec.h"
 #include "upcall/packbuff/Packbuff.h"
 #include "upcall/packbuff/UpcallMessage.h"
 

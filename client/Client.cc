@@ -4,9 +4,8 @@
 
 #include "Connection.h"
 #include "base/Try.h"
-#include "ipc/ContainerClasses.h"
-#include "ipc/Keys.h"
-#include "ipc/UUID.h"
+#include "ipc/Identifiers.h"
+#include "ipc/Protocol.h"
 
 #include <charconv>
 #include <iterator>

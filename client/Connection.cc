@@ -4,9 +4,8 @@
 #include "Diagnosis.h"
 #include "base/Try.h"
 #include "ipc/Frame.h"
-#include "ipc/Keys.h"
-#include "ipc/Names.h"
-#include "plist/Binary.h"
+#include "ipc/Protocol.h"
+#include "plist/Codec.h"
 
 #include <algorithm>
 #include <cerrno>

@@ -2,7 +2,7 @@
 #include "Diagnosis.h"
 
 #include "Connection.h"
-#include "ipc/Keys.h"
+#include "ipc/Protocol.h"
 
 #include <fcntl.h>
 #include <thread>

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // Which users own containers on a root: what the daemon there has written beside its sockets.
-#include "ipc/Names.h"
+#include "ipc/Protocol.h"
 #include "ipc/UserNumbers.h"
 #include "os/FileDescriptor.h"
 #include "zorvane/Client.h"

@@ -5,8 +5,7 @@
 #include "daemon/Composition.h"
 #include "daemon/LinuxPlatform.h"
 #include "fs/AtomicFile.h"
-#include "fs/DictionaryFile.h"
-#include "fs/RecursiveRemove.h"
+#include "fs/Trees.h"
 #include "store/Names.h"
 
 #include <algorithm>

@@ -6,7 +6,7 @@
 // The first byte chooses how the stream is cut, how many frames a turn may take, and whether nothing is served in the
 // turn in which it arrives (as when the peer leaves replies unread); the rest is the stream.
 #include "ipc/Frame.h"
-#include "service/ListenerInput.h"
+#include "service/ListenerStreams.h"
 
 #include <algorithm>
 #include <cstdlib>

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Any bytes as a container's metadata file. Whatever is accepted holds what the daemon relies on, and a file written
 // from the record reads back as the same record. The first byte chooses the user and whether the class path is checked.
-#include "plist/Binary.h"
+#include "plist/Codec.h"
 #include "store/ZORMetadata.h"
 
 #include <cstdlib>

@@ -3,7 +3,7 @@
 // next; a request that is accepted reads as the same again when it is packed anew, and so does a reply.
 //
 // The first byte chooses how the rest is taken, the second which operations a reader does, one after the other.
-#include "upcall/ProcessContainers.h"
+#include "upcall/UpcallServer.h"
 #include "upcall/packbuff/Packbuff.h"
 #include "upcall/packbuff/UpcallMessage.h"
 

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Any bytes as a binary property list. A value that reads has to be writable, and to read back as the same value and
 // the same bytes.
-#include "plist/Binary.h"
+#include "plist/Codec.h"
 
 #include <cstdlib>
 

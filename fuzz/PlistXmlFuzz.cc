@@ -1,8 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Any bytes as an XML property list. A value that reads has to be writable in the binary form and to read back from it
 // equal.
-#include "plist/Binary.h"
-#include "plist/Read.h"
+#include "plist/Codec.h"
 
 #include <cstdlib>
 

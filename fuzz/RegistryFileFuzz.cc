@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // Goal: no bytes of a registry file bring the reader down, and what it takes it understands. Method: parse; an entry
 // that comes out has the form that matching relies on.
-#include "base/EntitlementKeys.h"
-#include "identity/IdentityFile.h"
+#include "identity/RegistryFiles.h"
+#include "platform/Service.h"
 
 #include <cstddef>
 #include <cstdint>

@@ -22,7 +22,7 @@ CALLS = [
     ("std::filesystem <filesystem> std::ifstream std::ofstream std::fstream", (), PATHS),
     ("::open( ::creat( ::fopen( ::stat( ::lstat( ::access( ::opendir( ::readlink(", KERNEL, PATHS),
     # A home may be reached through links that its administrator made; it is resolved once.
-    ("::realpath(", (*KERNEL[:5], "src/store/UserHome.cc"), PATHS),
+    ("::realpath(", (*KERNEL[:5], "src/store/ZORPerUserConfiguration.cc"), PATHS),
     ("::truncate( ::rename( ::unlink( ::remove( ::rmdir( ::mkdir( ::link( ::symlink( ::chmod( ::chown( ::lchown( ::renameat( "
      "::renameat2( ::unlinkat( ::mkdirat( ::linkat( ::symlinkat( ::fchmod( ::fchmodat( ::fchown( ::fchownat( ::ftruncate( "
      "::fsetxattr( ::futimens( ::utimensat( ::fsync( ::fdatasync( ::syncfs( ::sync_file_range(",

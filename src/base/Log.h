@@ -12,7 +12,7 @@
 
 #include "base/ErrorCode.h"
 #include "base/Format.h"
-#include "platform/PlatformLog.h"
+#include "platform/Process.h"
 
 #include <atomic>
 #include <cstdint>

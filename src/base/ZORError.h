@@ -1,20 +1,25 @@
 // SPDX-License-Identifier: Apache-2.0
-// Errors of the daemon's own domain, and Result: the value of an operation, or its ZORError. An operation logs an
-// error or hands it on, as its description says. A code, once given out, keeps its meaning: clients get it as
-// "ReplyError".
+// The two ways in which an operation fails: with an error of the daemon's own domain, or with an exception that its
+// boundary turns into one.
+//
+// Result is the value of an operation, or its ZORError. An operation logs an error or hands it on, as its description
+// says. A code, once given out, keeps its meaning: clients get it as "ReplyError".
 #pragma once
 
 #include "base/ErrorCode.h"
 #include "base/Log.h"
 #include "base/Try.h"
+#include "platform/Device.h"
 #include "platform/Errno.h"
 
 #include <cstdint>
+#include <exception>
 #include <expected>
 #include <memory>
 #include <optional>
 #include <string>
 #include <utility>
+#include <vector>
 
 namespace zor {
 
@@ -94,5 +99,56 @@ template <typename T>
 ZORError takeError(Result<T>& result) {
     return std::move(result).error();
 }
+
+// Exceptions of this daemon, and the boundary at which an operation turns one into error 40.
+//
+// An exception means that something happened which the code has no road for: memory ran out, an invariant of a library
+// was broken. It is caught once, at the boundary of the operation; what the operation holds is released by unwinding.
+// Only std::exception and what derives from it counts; anything else passes through and is nobody's to swallow.
+
+/// The functions on the calling thread's stack, innermost first.
+std::vector<std::string> callStackSymbols();
+
+class ZORException : public std::exception {
+public:
+    ZORException(std::string name, std::string reason);
+    [[nodiscard]] const char* what() const noexcept override { return description_.c_str(); }
+    [[nodiscard]] const std::string& name() const { return name_; }
+    [[nodiscard]] const std::string& reason() const { return reason_; }
+    [[nodiscard]] const std::vector<std::string>& callStack() const { return callStack_; }
+
+private:
+    std::string name_;
+    std::string reason_;
+    std::string description_;
+    std::vector<std::string> callStack_;
+};
+
+class ExceptionBoundary {
+public:
+    ExceptionBoundary(const Log& log, const platform::InternalBuildQuery& internalBuild,
+                      platform::CrashAnnotation& crash)
+        : log_(log), internalBuild_(internalBuild), crash_(crash) {}
+
+    /// Runs `body`; an exception becomes error 40, logged under `here`. On internal builds the process ends instead.
+    template <typename Body>
+    auto run(Here here, Body&& body) -> decltype(body()) {
+        try {
+            return body();
+        } catch (const std::exception& exception) {
+            return caught(here, exception);
+        }
+    }
+
+    /// Error 40 for an exception, built and logged; ends the process on internal builds.
+    ZORError caught(Here here, const std::exception& exception);
+
+private:
+    [[noreturn]] void reportFatal(const std::exception& exception);
+
+    const Log& log_;
+    const platform::InternalBuildQuery& internalBuild_;
+    platform::CrashAnnotation& crash_;
+};
 
 } // namespace zor

@@ -1,14 +1,15 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "check/ContainerCheck.h"
+// The class directories and the containers in them.
+#include "check/Checks.h"
 
-#include "base/UserIdentity.h"
-#include "check/Repair.h"
+#include "base/ContainerClass.h"
+#include "check/Finding.h"
 #include "fs/AtomicFile.h"
 #include "fs/ItemStatus.h"
 #include "fs/Names.h"
-#include "ipc/Keys.h"
-#include "os/Names.h"
-#include "os/Openat2.h"
+#include "ipc/Protocol.h"
+#include "os/FileDescriptor.h"
+#include "os/SystemRoot.h"
 #include "store/Names.h"
 #include "store/ZORGlobalConfiguration.h"
 

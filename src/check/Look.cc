@@ -1,12 +1,12 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "check/Look.h"
 
-#include "base/UserIdentity.h"
-#include "fs/BulkDirectoryRead.h"
+#include "base/ContainerClass.h"
+#include "fs/ItemStatus.h"
 #include "fs/PathResolver.h"
-#include "os/Names.h"
+#include "os/SystemRoot.h"
 #include "store/Names.h"
-#include "store/UserHome.h"
+#include "store/ZORPerUserConfiguration.h"
 
 #include <cerrno>
 #include <sys/stat.h>

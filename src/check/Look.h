@@ -3,9 +3,7 @@
 // its descriptor.
 #pragma once
 
-#include "check/CheckedSystem.h"
 #include "check/Finding.h"
-#include "check/Repair.h"
 #include "check/StoreCheck.h"
 #include "os/FileDescriptor.h"
 #include "platform/Errno.h"

@@ -1,7 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "check/ReferenceCheck.h"
+// Shared and system containers against the entitlements that keep them.
+#include "check/Checks.h"
 
-#include "base/UserIdentity.h"
+#include "base/ContainerClass.h"
 #include "store/EntitlementFile.h"
 
 #include <algorithm>

@@ -1,14 +1,15 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "check/WorkCheck.h"
+// The daemon's own directories and marks.
+#include "check/Checks.h"
 
 #include "base/Format.h"
 #include "device/LinkSandboxUserState.h"
 #include "fs/AtomicFile.h"
-#include "fs/DiskUsage.h"
 #include "fs/FileSystemDeathRow.h"
 #include "fs/Names.h"
-#include "os/Names.h"
-#include "os/Openat2.h"
+#include "fs/Trees.h"
+#include "os/FileDescriptor.h"
+#include "os/SystemRoot.h"
 #include "store/ReplaceJournal.h"
 
 #include <algorithm>

@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/CommandTable.h"
 
-#include "base/EntitlementKeys.h"
 #include "daemon/commands/Commands.h"
+#include "platform/Service.h"
 
 namespace zor {
 

@@ -2,10 +2,10 @@
 // The commands that a client may send: which entitlement each needs, who handles it, and who sends the reply.
 #pragma once
 
-#include "base/UserIdentity.h"
+#include "base/ContainerClass.h"
 #include "daemon/Operations.h"
 #include "daemon/ZORClientConnection.h"
-#include "ipc/Keys.h"
+#include "ipc/Protocol.h"
 #include "platform/Service.h"
 
 #include <array>

@@ -6,9 +6,9 @@
 // or a test with its own root, can live in the same process. Destruction goes the other way round.
 #pragma once
 
+#include "base/ContainerClass.h"
 #include "base/Log.h"
-#include "base/UserIdentity.h"
-#include "base/ZORException.h"
+#include "base/ZORError.h"
 #include "base/ZORLocks.h"
 #include "daemon/Dispatcher.h"
 #include "daemon/Operations.h"

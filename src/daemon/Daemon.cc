@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/Daemon.h"
 
-#include "ipc/Names.h"
-#include "os/Names.h"
+#include "ipc/Protocol.h"
+#include "os/SystemRoot.h"
 #include "service/ServiceListener.h"
 
 namespace zor {

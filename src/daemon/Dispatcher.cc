@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/Dispatcher.h"
 
-#include "base/EntitlementKeys.h"
 #include "base/Log.h"
-#include "ipc/Identifier.h"
+#include "ipc/Identifiers.h"
+#include "platform/Service.h"
 
 #include <algorithm>
 

@@ -5,7 +5,7 @@
 // peer between messages. Messages of one connection come one at a time, those of different ones in parallel.
 #pragma once
 
-#include "base/UserIdentity.h"
+#include "base/ContainerClass.h"
 #include "daemon/CommandTable.h"
 #include "daemon/Operations.h"
 #include "platform/Service.h"

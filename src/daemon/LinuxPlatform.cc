@@ -3,8 +3,8 @@
 
 #include "base/Try.h"
 #include "fs/AtomicFile.h"
-#include "identity/UserConfiguration.h"
-#include "os/Names.h"
+#include "identity/Users.h"
+#include "os/SystemRoot.h"
 
 #include <algorithm>
 #include <cerrno>

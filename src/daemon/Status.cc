@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/Status.h"
 
-#include "base/EntitlementKeys.h"
-#include "ipc/Keys.h"
+#include "ipc/Protocol.h"
+#include "platform/Service.h"
 
 #include <unistd.h>
 

@@ -4,7 +4,7 @@
 #pragma once
 
 #include "daemon/Composition.h"
-#include "platform/PeerIdentity.h"
+#include "platform/Service.h"
 #include "plist/Value.h"
 #include "service/StatusSocket.h"
 

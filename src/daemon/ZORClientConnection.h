@@ -7,7 +7,7 @@
 #pragma once
 
 #include "daemon/Operations.h"
-#include "operations/Caller.h"
+#include "operations/Basics.h"
 
 #include <functional>
 #include <memory>

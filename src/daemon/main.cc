@@ -7,11 +7,11 @@
 #include "daemon/Status.h"
 #include "identity/AddressSpace.h"
 #include "os/FileDescriptor.h"
-#include "os/Names.h"
 #include "os/RunLoop.h"
 #include "os/ServiceManager.h"
+#include "os/SystemRoot.h"
 #include "service/StatusSocket.h"
-#include "store/RootNeeds.h"
+#include "store/StorePlaces.h"
 
 #include <atomic>
 #include <csignal>

@@ -2,8 +2,8 @@
 #include "device/FileCrashAnnotation.h"
 
 #include "base/Try.h"
-#include "os/Names.h"
-#include "os/Openat2.h"
+#include "os/FileDescriptor.h"
+#include "os/SystemRoot.h"
 
 #include <cerrno>
 #include <fcntl.h>

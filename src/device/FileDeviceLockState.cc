@@ -3,10 +3,10 @@
 
 #include "base/Try.h"
 #include "os/CoarseClock.h"
-#include "os/Inotify.h"
-#include "os/Names.h"
-#include "os/Openat2.h"
+#include "os/FileChanges.h"
+#include "os/FileDescriptor.h"
 #include "os/RunLoop.h"
+#include "os/SystemRoot.h"
 
 #include <cerrno>
 #include <charconv>

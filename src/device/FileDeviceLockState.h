@@ -13,8 +13,8 @@
 #pragma once
 
 #include "base/Mutex.h"
+#include "os/FileChanges.h"
 #include "os/FileDescriptor.h"
-#include "os/FileStamp.h"
 #include "os/RunLoop.h"
 #include "os/SystemRoot.h"
 #include "platform/Device.h"

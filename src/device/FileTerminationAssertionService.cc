@@ -3,8 +3,8 @@
 
 #include "base/Format.h"
 #include "base/Try.h"
-#include "os/Names.h"
-#include "os/Openat2.h"
+#include "os/FileDescriptor.h"
+#include "os/SystemRoot.h"
 
 #include <cerrno>
 #include <chrono>

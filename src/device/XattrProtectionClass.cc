@@ -3,7 +3,7 @@
 
 #include "base/Try.h"
 #include "os/FileDescriptor.h"
-#include "os/Names.h"
+#include "os/SystemRoot.h"
 
 #include <cerrno>
 #include <charconv>

@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "fs/CopyItem.h"
+// One item copied, out of a copy of a tree.
+#include "fs/Trees.h"
 
 #include "base/Try.h"
 

@@ -1,13 +1,13 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "fs/DiskUsage.h"
+// The measurement of a tree.
+#include "fs/Trees.h"
 
 #include "base/Log.h"
 #include "base/ZORError.h"
-#include "fs/BulkDirectoryRead.h"
 #include "fs/ItemStatus.h"
 #include "fs/SharedWork.h"
 #include "fs/TreeWalker.h"
-#include "os/Openat2.h"
+#include "os/FileDescriptor.h"
 
 #include <algorithm>
 #include <cerrno>

@@ -3,7 +3,7 @@
 
 #include "base/Try.h"
 #include "fs/Names.h"
-#include "os/Openat2.h"
+#include "os/FileDescriptor.h"
 
 #include <cerrno>
 #include <fcntl.h>

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/MountFences.h"
 
-#include "os/Openat2.h"
+#include "os/FileDescriptor.h"
 
 #include <algorithm>
 #include <array>

@@ -2,7 +2,7 @@
 #include "fs/PathResolver.h"
 
 #include "base/Try.h"
-#include "os/Openat2.h"
+#include "os/FileDescriptor.h"
 
 #include <algorithm>
 #include <cerrno>

@@ -2,14 +2,12 @@
 // Private to the copy: the hidden directory ".links-…" in the destination's root. It holds one more link to each copied
 // file whose source has several, named after the source's inode, so that the next name of that file becomes a link and
 // nothing has to be kept in memory. It goes before the root gets its attributes.
-#include "fs/RecursiveCopy.h"
+#include "fs/Trees.h"
 
 #include "base/Try.h"
-#include "fs/CopyItem.h"
 #include "fs/ItemStatus.h"
-#include "fs/RecursiveRemove.h"
 #include "fs/TreeWalker.h"
-#include "os/Openat2.h"
+#include "os/FileDescriptor.h"
 
 #include <array>
 #include <cerrno>

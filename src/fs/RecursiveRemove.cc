@@ -1,10 +1,11 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "fs/RecursiveRemove.h"
+// The removal of a tree.
+#include "fs/Trees.h"
 
 #include "base/Try.h"
 #include "fs/ItemStatus.h"
 #include "fs/TreeWalker.h"
-#include "os/Openat2.h"
+#include "os/FileDescriptor.h"
 
 #include <algorithm>
 #include <cerrno>

@@ -5,7 +5,7 @@
 #include "fs/AtomicFile.h"
 #include "fs/ItemStatus.h"
 #include "fs/PathResolver.h"
-#include "os/Openat2.h"
+#include "os/FileDescriptor.h"
 
 #include <cerrno>
 #include <fcntl.h>

@@ -1,16 +1,13 @@
 // SPDX-License-Identifier: Apache-2.0
 // The file manager's work on whole trees: removing, copying, moving, walking, listing, measuring.
 #include "fs/AtomicFile.h"
-#include "fs/BulkDirectoryRead.h"
-#include "fs/DiskUsage.h"
 #include "fs/ItemStatus.h"
 #include "fs/Names.h"
 #include "fs/PathResolver.h"
-#include "fs/RecursiveCopy.h"
-#include "fs/RecursiveRemove.h"
 #include "fs/TreeWalker.h"
+#include "fs/Trees.h"
 #include "fs/ZORFileManager.h"
-#include "os/Openat2.h"
+#include "os/FileDescriptor.h"
 
 #include <cerrno>
 #include <dirent.h>

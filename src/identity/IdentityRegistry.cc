@@ -3,8 +3,8 @@
 
 #include "base/Format.h"
 #include "os/CoarseClock.h"
-#include "os/Names.h"
 #include "os/RunLoop.h"
+#include "os/SystemRoot.h"
 #include "plist/Value.h"
 
 #include <algorithm>

@@ -18,10 +18,9 @@
 
 #include "base/Mutex.h"
 #include "identity/RegisteredExecutables.h"
-#include "identity/RegistryDirectory.h"
+#include "identity/RegistryFiles.h"
 #include "identity/RegistryWatches.h"
-#include "platform/PlatformLog.h"
-#include "platform/WorkQueue.h"
+#include "platform/Process.h"
 
 #include <atomic>
 #include <cstdint>

@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "identity/RegisteredExecutables.h"
 
-#include "os/Inotify.h"
-#include "os/Openat2.h"
+#include "os/FileChanges.h"
+#include "os/FileDescriptor.h"
 
 #include <climits>
 #include <fcntl.h>

@@ -8,7 +8,7 @@
 #pragma once
 
 #include "base/Mutex.h"
-#include "identity/RegistryDirectory.h"
+#include "identity/RegistryFiles.h"
 #include "os/BoundedQuestion.h"
 #include "os/FileDescriptor.h"
 

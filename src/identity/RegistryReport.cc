@@ -1,12 +1,12 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "identity/RegistryReport.h"
 
-#include "base/EntitlementKeys.h"
 #include "base/Format.h"
 #include "identity/IdentityRegistry.h"
-#include "os/Names.h"
-#include "os/Openat2.h"
-#include "plist/Read.h"
+#include "os/FileDescriptor.h"
+#include "os/SystemRoot.h"
+#include "platform/Service.h"
+#include "plist/Codec.h"
 
 #include <algorithm>
 #include <array>

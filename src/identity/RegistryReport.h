@@ -4,7 +4,7 @@
 // any thread.
 #pragma once
 
-#include "identity/RegistryDirectory.h"
+#include "identity/RegistryFiles.h"
 
 #include <optional>
 #include <string>

@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "identity/RegistryWatches.h"
 
-#include "os/Inotify.h"
-#include "os/Names.h"
-#include "os/Openat2.h"
+#include "os/FileChanges.h"
+#include "os/FileDescriptor.h"
+#include "os/SystemRoot.h"
 
 #include <algorithm>
 #include <chrono>

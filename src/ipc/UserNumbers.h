@@ -5,7 +5,7 @@
 // functions, any thread.
 #pragma once
 
-#include "ipc/ContainerClasses.h"
+#include "ipc/Protocol.h"
 #include "platform/Errno.h"
 
 #include <algorithm>

@@ -3,13 +3,11 @@
 
 #include "base/BlockingScope.h"
 #include "fs/AtomicFile.h"
-#include "fs/DictionaryFile.h"
 #include "fs/ItemStatus.h"
 #include "os/FileDescriptor.h"
-#include "os/Openat2.h"
-#include "plist/Binary.h"
-#include "store/ContainerLayout.h"
+#include "plist/Codec.h"
 #include "store/Names.h"
+#include "store/StorePlaces.h"
 
 #include <algorithm>
 #include <cerrno>

@@ -9,12 +9,11 @@
 #include "base/ContainerClass.h"
 #include "base/FileURL.h"
 #include "base/ZORError.h"
-#include "ipc/UUID.h"
+#include "ipc/Identifiers.h"
+#include "operations/Basics.h"
 #include "operations/DeathRow.h"
 #include "operations/LastingMoves.h"
-#include "operations/RecordNeeds.h"
 #include "operations/ReplaceRecovery.h"
-#include "operations/SandboxMappings.h"
 #include "store/ZORGlobalConfiguration.h"
 
 #include <cstdint>

@@ -12,14 +12,14 @@
 
 #include "base/ContainerClass.h"
 #include "base/ZORError.h"
-#include "ipc/UUID.h"
-#include "operations/Caller.h"
+#include "base/ZORLocks.h"
+#include "ipc/Identifiers.h"
+#include "operations/Basics.h"
 #include "operations/ContainerMaker.h"
 #include "operations/DeathRow.h"
 #include "operations/LastingMoves.h"
-#include "operations/RecordNeeds.h"
 #include "operations/ReplaceRecovery.h"
-#include "store/StoreLimits.h"
+#include "store/ZORContainerCache.h"
 #include "store/ZOREntitlementMapping.h"
 #include "store/ZORGlobalConfiguration.h"
 
@@ -29,6 +29,17 @@
 #include <string>
 
 namespace zor {
+
+// Finding a live container while nobody writes: without the all-identifiers lock, and without making or changing
+// anything. Most lookups end here. Why such a lookup never answers from the middle of a writer stands in
+// docs/decisions/0008-lookups-without-the-lock.md.
+
+/// The container as it is, on the disk and in the cache at one moment; nullopt when it is not there, or when anything
+/// about it is out of the ordinary: then only the lookup under the lock can tell. The caller holds no identifier lock.
+/// Waits for writers that are under way, for no reader. Any thread.
+[[nodiscard]] std::optional<ZORContainerCache::LiveContainer>
+lookUpUndisturbed(ZORLocks& locks, ZORContainerCache& cache, std::uint32_t userId, ContainerClass containerClass,
+                  const std::string& identifier);
 
 /// A container as an operation found or made it. The parts of the record that a reply needs were read while the
 /// operation still held its lock, so one client never sees what another's request made of the shared record meanwhile.
@@ -63,7 +74,7 @@ public:
 
     /// The container of (user, identifier, class), created if asked, and on the disk; error 38 where its user has as
     /// many as one may have and the caller does not own the root. Runs under the all-identifiers lock held for writing,
-    /// where a live container is not simply found (UndisturbedLookup.h). `identifier` nullptr: error 11.
+    /// where a live container is not simply found (lookUpUndisturbed). `identifier` nullptr: error 11.
     Result<FoundContainer> createOrLookupContainerForUser(const Caller& caller, std::uint32_t userId,
                                                           const std::string* identifier, ContainerClass containerClass,
                                                           const CreateOrLookupOptions& options);

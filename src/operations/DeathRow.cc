@@ -4,11 +4,13 @@
 #include "fs/AtomicFile.h"
 #include "fs/FileSystemDeathRow.h"
 #include "fs/Names.h"
-#include "os/Openat2.h"
+#include "os/FileDescriptor.h"
+#include "store/Names.h"
 
 #include <cerrno>
 #include <cstdio>
 #include <fcntl.h>
+#include <sys/xattr.h>
 #include <unistd.h>
 
 namespace zor {
@@ -208,6 +210,251 @@ Result<void> DeathRow::putBackIfAnothers(int from, const FileURL& url, int to, c
                      ZOR_SHOWN(back), renamed ? ": " : "", renamed ? renamed.text() : "");
     return posixError({moveFunction, __LINE__}, Errno(notTheContainer), "%s was swapped while it was taken away",
                       url.c_str());
+}
+
+// The passes that delete what earlier ones could not remove, and what is on death row: root's, and that of each other
+// file system that holds containers.
+//
+// Passes run one after another on the death-row queue and take no lock. Items are taken as the directory is read, so no
+// number of them is too large for the memory, and none that fails keeps the others. A power cut leaves what was on
+// death row: nothing is removed whose move here could still be undone.
+//
+// An item that cannot be removed goes to the directory for temporary files, as root's and closed, and marked, so that
+// later passes, of later daemons too, know it for theirs: only root can set such a mark, and names in that directory
+// are anybody's to make. Killed between the steps, it is still on death row, closed. Nothing is copied: from another
+// file system than that directory's it stays on its death row, which is closed.
+
+namespace {
+
+constexpr const char* passFunction = "deleteContainersOnDeathRowWithCompletion";
+constexpr mode_t closedMode = 0700;
+
+const char* undeletedMark() {
+    return ::geteuid() == 0 ? names::undeletedAttribute : names::undeletedAttributeUser;
+}
+
+/// Root's alone and marked, so that a later pass finds it.
+Errno closeAndMark(platform::Disk& disk, int directory) {
+    static constexpr std::uint8_t mark[] = {'1'};
+    TRY(disk.changeOwner(directory, ::geteuid(), ::getegid()));
+    TRY(disk.changeMode(directory, closedMode));
+    return disk.setAttribute(directory, undeletedMark(), mark);
+}
+
+/// Whether an open directory is what closeAndMark made of it.
+bool isClosedAndMarked(int directory) {
+    struct stat status{};
+    return ::fstat(directory, &status) == 0 && status.st_uid == ::geteuid() && (status.st_mode & 0777) == closedMode &&
+           ::fgetxattr(directory, undeletedMark(), nullptr, 0) > 0;
+}
+
+} // namespace
+
+/// The state of one pass.
+struct DeathRow::Pass {
+    std::optional<ZORError> last;
+    Left left;
+    /// Tops of mounts that have been looked at.
+    std::set<std::pair<dev_t, ino_t>> seen;
+};
+
+void DeathRow::deleteContainersOnDeathRowWithCompletion(std::function<void(ErrorCode)> completion) {
+    // A pass that has not begun finds what comes until then: only who wants to be told of its end needs another. Else
+    // whoever sends something here over and over would queue passes without end, each of which keeps the daemon busy.
+    const bool isAwaited = completion != nullptr;
+    if (!isAwaited && passWaits_.exchange(true))
+        return;
+    try {
+        ZORDispatchAsyncWithTransaction(needs_.background, [this, completion = std::move(completion), isAwaited] {
+            if (!isAwaited)
+                passWaits_ = false;
+            runDeletionPass(completion);
+        });
+    } catch (...) {
+        if (!isAwaited)
+            passWaits_ = false;
+        throw;
+    }
+}
+
+void DeathRow::runDeletionPass(const std::function<void(ErrorCode)>& completion) {
+    const auto passed = needs_.boundary.run({passFunction, __LINE__}, [&]() -> Result<void> {
+        Pass pass;
+        deleteWhatIsInTemporary();
+        deleteEverythingHidden(pass);
+        deleteEverythingOnDeathRow(pass);
+        for (const FileURL& place : needs_.configuration.placesOfContainers())
+            deleteEverythingOnDeathRowOf(place, pass);
+        if (inTemporary_)
+            for (const std::string& name : *inTemporary_)
+                pass.left.add(needs_.configuration.temporaryDirectory().appendingDirectory(name).path());
+        {
+            const platform::MutexLock held(leftMutex_);
+            left_ = std::move(pass.left);
+        }
+        if (pass.last)
+            return std::move(*pass.last);
+        return {};
+    });
+    if (completion)
+        completion(passed ? ErrorCode::success : passed.error().replyCode());
+}
+
+Result<void> DeathRow::forEachCondemned(int directory, const FileURL& row,
+                                        const std::function<Result<void>(const FileURL&)>& remove, Pass& pass) {
+    constexpr Here here{passFunction, __LINE__};
+    std::optional<ZORError> unsynced;
+    bool first = true;
+    const auto listed = needs_.fileManager.forEachItemIn(
+        directory, row, ZORFileManager::Leftovers::shown, [&](int, const FileURL& item) {
+            // A power cut could bring back a container that is half removed where nothing keeps the order of changes.
+            const Errno error = first ? needs_.durability.beforeRemoval(directory) : Errno();
+            first = false;
+            if (error) {
+                unsynced = posixError(here, error, "sync of %s failed: %s", row.c_str(), error.text());
+                return false;
+            }
+            {
+                const platform::MutexLock judged(moving_);
+            }
+            const auto removed = needs_.boundary.run(here, [&] { return remove(item); });
+            if (!removed) {
+                pass.left.add(item.path());
+                pass.last = makeError(needs_.log, here, ErrorCode::deathRowItemNotDestroyed, &removed.error(),
+                                      LogFlag::yes, "Failed to destroy item at: %s", item.c_str());
+            }
+            return true;
+        });
+    return unsynced ? Result<void>(std::move(*unsynced)) : listed;
+}
+
+void DeathRow::deleteEverythingOnDeathRow(Pass& pass) {
+    const FileURL deathRow = needs_.configuration.deathrowDirectory();
+    const auto opened = needs_.fileManager.resolver().openDirectory(deathRow);
+    const auto emptied =
+        opened ? forEachCondemned(
+                     opened->get(), deathRow, [&](const FileURL& item) { return _removeItemOrMoveToTempAtURL(item); },
+                     pass)
+               : Result<void>(posixError({passFunction, __LINE__}, opened.error(), "opendir of %s failed: %s",
+                                         deathRow.c_str(), opened.error().text()));
+    if (emptied)
+        return;
+    pass.last = emptied.error().isPosix(ENOENT)
+                    ? emptied.error()
+                    : makeError(needs_.log, {passFunction, __LINE__}, ErrorCode::listForDeletionFailed,
+                                &emptied.error(), LogFlag::yes, "Failed to get items for deletion: %s : %s",
+                                deathRow.c_str(), emptied.error().text().c_str());
+}
+
+void DeathRow::deleteEverythingHidden(Pass& pass) {
+    std::vector<Hidden> hidden;
+    {
+        const platform::MutexLock held(hiddenMutex_);
+        hidden.swap(hidden_);
+    }
+    for (Hidden& one : hidden) {
+        const auto parent = needs_.fileManager.resolver().openParent(one.url);
+        if (!parent)
+            continue; // the next boot finds it
+        // Its owner may have put another's directory in its place since it was judged.
+        const auto removed = needs_.fileManager.removeItemIn(
+            parent->directory.get(), one.url, [&](int directory) { return !one.owner || isOf(directory, *one.owner); });
+        if (removed)
+            continue;
+        pass.left.add(one.url.path());
+        pass.last = makeError(needs_.log, {passFunction, __LINE__}, ErrorCode::deathRowItemNotDestroyed,
+                              &removed.error(), LogFlag::yes, "Failed to destroy item at: %s", one.url.c_str());
+        if (removed.error().isPosix(ESTALE))
+            continue;
+        const platform::MutexLock held(hiddenMutex_);
+        hidden_.push_back(std::move(one));
+    }
+}
+
+void DeathRow::deleteEverythingOnDeathRowOf(const FileURL& place, Pass& pass) {
+    ZORFileManager& fileManager = needs_.fileManager;
+    const auto top = fs::topOfMount(fileManager.resolver(), place);
+    if (!top || !pass.seen.insert(top->identity).second)
+        return;
+    const auto row = fs::openDeathRow(top->directory.get());
+    if (!row)
+        return;
+    const FileURL url = fs::deathRowBelow(top->url);
+    const auto emptied = forEachCondemned(
+        row->get(), url, [&](const FileURL& item) { return fileManager.removeItemIn(row->get(), item); }, pass);
+    if (!emptied)
+        pass.last = makeError(needs_.log, {passFunction, __LINE__}, ErrorCode::listForDeletionFailed, &emptied.error(),
+                              LogFlag::yes, "Failed to get items for deletion: %s : %s", url.c_str(),
+                              emptied.error().text().c_str());
+    const platform::MutexLock moving(moving_);
+    fs::removeEmptyDeathRow(fileManager.disk(), top->directory.get());
+}
+
+Result<void> DeathRow::_removeItemOrMoveToTempAtURL(const FileURL& url) {
+    ZORFileManager& fileManager = needs_.fileManager;
+    const auto removed = fileManager.removeItemAtURL(url);
+    if (removed || removed.error().isPosix(ENOENT))
+        return {};
+    ZOR_LOG(needs_.log, logLevelDebug, "Couldn't remove, so moving item to /tmp: %s : %s", url.c_str(),
+            removed.error().text().c_str());
+    const FileURL temporary = needs_.configuration.temporaryDirectory();
+    const auto moved = moveToTemporary(url, temporary.appendingDirectory(url.lastPathComponent()));
+    if (moved)
+        return {};
+    return makeError(needs_.log, ZOR_HERE, ErrorCode::moveToTemporaryFailed, &moved.error(), LogFlag::yes,
+                     "Failed to move dir: %s to: %s", url.c_str(), temporary.c_str());
+}
+
+Result<void> DeathRow::moveToTemporary(const FileURL& url, const FileURL& destination) {
+    ZORFileManager& fileManager = needs_.fileManager;
+    const auto item = fileManager.resolver().openDirectory(url);
+    const auto from = fileManager.resolver().openParent(url);
+    const auto to = fileManager.resolver().openParent(destination);
+    Errno error = !item ? item.error() : !from ? from.error() : !to ? to.error() : Errno();
+    if (!error)
+        error = closeAndMark(fileManager.disk(), item->get());
+    if (error)
+        return posixError(ZOR_HERE, error, "closing of %s failed: %s", url.c_str(), error.text());
+    TRY(fileManager.renameItem(from->directory.get(), url, to->directory.get(), destination));
+    if (inTemporary_)
+        inTemporary_->emplace(destination.lastPathComponent());
+    return {};
+}
+
+void DeathRow::findInTemporary(int directory, const FileURL& temporary) {
+    auto& known = inTemporary_.emplace();
+    (void)needs_.fileManager.forEachItemIn(
+        directory, temporary, ZORFileManager::Leftovers::shown, [&](int, const FileURL& item) {
+            const std::string name(item.lastPathComponent());
+            if (!item.isDirectory())
+                return true;
+            const auto opened =
+                platform::openBeneathOnMount(directory, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
+            if (opened && isClosedAndMarked(opened->get()))
+                known.insert(name);
+            return true;
+        });
+}
+
+void DeathRow::deleteWhatIsInTemporary() {
+    const FileURL temporary = needs_.configuration.temporaryDirectory();
+    const auto directory = needs_.fileManager.resolver().openDirectory(temporary);
+    if (!directory)
+        return;
+    auto& known = inTemporary_;
+    if (!known)
+        findInTemporary(directory->get(), temporary);
+    std::erase_if(*known, [&](const std::string& name) {
+        const auto opened =
+            platform::openBeneathOnMount(directory->get(), name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
+        // Somebody else may have removed it, and another may have taken the name.
+        if (!opened || !isClosedAndMarked(opened->get()))
+            return true;
+        const FileURL item = temporary.appendingDirectory(name);
+        return needs_.boundary
+            .run({passFunction, __LINE__}, [&] { return needs_.fileManager.removeItemIn(directory->get(), item); })
+            .has_value();
+    });
 }
 
 } // namespace zor

@@ -3,7 +3,7 @@
 //
 // A move here is one rename on the caller's thread, usually under the locks of its operation; the item gets a name of
 // its own, so names never collide. An item on another file system than root's death row goes to a death row there
-// (fs/FileSystemDeathRow.h): nothing is ever copied to get out of the way. Passes (DeletionPass.cc) delete it later, on
+// (fs/FileSystemDeathRow.h): nothing is ever copied to get out of the way. Passes delete it later, on
 // the death-row queue; what is on death row belongs to no container. A stop at any point leaves items, or empty
 // directories of theirs, for the next pass; the launch queues one.
 //
@@ -21,10 +21,9 @@
 #include "base/FileURL.h"
 #include "base/Mutex.h"
 #include "base/ZORError.h"
-#include "base/ZORException.h"
 #include "fs/Durability.h"
 #include "fs/ZORFileManager.h"
-#include "operations/Background.h"
+#include "operations/Basics.h"
 #include "store/ZORGlobalConfiguration.h"
 
 #include <atomic>

@@ -10,12 +10,11 @@
 
 #include "base/ContainerClass.h"
 #include "base/ZORError.h"
-#include "ipc/UUID.h"
-#include "operations/Caller.h"
+#include "ipc/Identifiers.h"
+#include "operations/Basics.h"
 #include "operations/ContainerRemoval.h"
 #include "operations/Creation.h"
 #include "operations/EntitlementChange.h"
-#include "operations/RecordNeeds.h"
 
 #include <cstdint>
 #include <expected>

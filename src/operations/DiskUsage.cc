@@ -2,7 +2,7 @@
 #include "operations/DiskUsage.h"
 
 #include "base/BlockingScope.h"
-#include "ipc/Keys.h"
+#include "ipc/Protocol.h"
 
 #include <cerrno>
 #include <expected>

@@ -11,13 +11,10 @@
 // is kept only if the lock, taken again, finds the same container at the same place. Any thread.
 #pragma once
 
-#include "base/ErrorCode.h"
 #include "base/ZORError.h"
 #include "fs/ZORFileManager.h"
-#include "operations/Caller.h"
+#include "operations/Basics.h"
 #include "operations/InfoValues.h"
-#include "operations/KnownContainer.h"
-#include "operations/RecordNeeds.h"
 
 #include <chrono>
 #include <cstdint>

@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "operations/EntitlementChange.h"
 
-#include "base/UserIdentity.h"
-#include "ipc/Identifier.h"
-#include "ipc/Keys.h"
+#include "base/ContainerClass.h"
+#include "ipc/Identifiers.h"
+#include "ipc/Protocol.h"
 
 #include <algorithm>
 #include <exception>

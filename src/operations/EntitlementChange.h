@@ -12,12 +12,11 @@
 // before it is applied, and who settles takes all that were left before it syncs. Any thread.
 #pragma once
 
-#include "base/ErrorCode.h"
 #include "base/FileURL.h"
 #include "base/Mutex.h"
 #include "base/ZORError.h"
+#include "operations/Basics.h"
 #include "operations/ContainerRemoval.h"
-#include "operations/RecordNeeds.h"
 #include "operations/ZORGroupManager.h"
 #include "plist/Value.h"
 #include "store/ZOREntitlementMapping.h"

@@ -7,11 +7,9 @@
 
 #include "base/ZORError.h"
 #include "fs/ZORFileManager.h"
-#include "operations/Caller.h"
-#include "operations/KnownContainer.h"
-#include "operations/RecordNeeds.h"
+#include "operations/Basics.h"
 #include "plist/Value.h"
-#include "store/StoreLimits.h"
+#include "store/ZORContainerCache.h"
 #include "store/ZORMetadata.h"
 
 #include <atomic>

@@ -2,7 +2,7 @@
 #include "operations/LastingMoves.h"
 
 #include "base/BlockingScope.h"
-#include "os/Openat2.h"
+#include "os/FileDescriptor.h"
 
 #include <algorithm>
 #include <fcntl.h>
@@ -45,6 +45,35 @@ ZORError LastingMoves::notLasting(const char* function, ErrorCode code, const Fi
     return makeError(log_, {function, __LINE__}, code, &cause, LogFlag::yes,
                      "%s is in its place, but a power cut may undo that (%s); ask for it again", container.c_str(),
                      cause.text().c_str());
+}
+
+bool SandboxMappings::_setSandboxContainerMappingForUser(std::uint32_t userId, const std::string& identifier,
+                                                         ContainerClass containerClass,
+                                                         const std::optional<FileURL>& url) {
+    const auto classNumber = static_cast<unsigned long long>(containerClass);
+    if (!isPerUserClass(containerClass)) {
+        log_.write(logLevelError, __func__, "Unsupported class for setting sandbox container mapping: %llu",
+                   classNumber);
+        return false;
+    }
+    const auto type = containerClass == ContainerClass::sharedAppGroup ? platform::SandboxItemType::groupContainer
+                                                                       : platform::SandboxItemType::dataContainer;
+    const auto typeNumber = static_cast<unsigned long long>(type);
+    if (const Errno error = sandbox_.setMapping(userId, type, identifier, std::nullopt)) {
+        log_.write(logLevelError, __func__,
+                   "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, class: %llu, path: %s : %d",
+                   userId, typeNumber, ZOR_SHOWN(identifier), classNumber, "(null)", error.number());
+        return false;
+    }
+    if (!url)
+        return true;
+    if (const Errno error = sandbox_.setMapping(userId, type, identifier, url->path())) {
+        log_.write(logLevelError, __func__,
+                   "Failed to set mapping for user: %u, itemType: %llu, identifier %s, class: %llu, path: %s : %d",
+                   userId, typeNumber, ZOR_SHOWN(identifier), classNumber, url->c_str(), error.number());
+        return false;
+    }
+    return true;
 }
 
 } // namespace zor

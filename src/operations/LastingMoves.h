@@ -1,17 +1,24 @@
 // SPDX-License-Identifier: Apache-2.0
-// The last step of an operation that moved containers, before it answers: the moves are to be on the disk.
+// The last steps of an operation that moved containers, before it answers: the moves are to be on the disk, and the
+// sandbox is to know where the containers are.
 //
 // Syncs run without locks wherever that can be. One that fails leaves what was moved in its new place, and the answer
-// says that a power cut may undo it. Any thread.
+// says that a power cut may undo it. A stop between the removal of a mapping and its new setting leaves none; the
+// operation that sets it is repeated or rolled back by its own recovery. Any thread.
 #pragma once
 
+#include "base/ContainerClass.h"
 #include "base/FileURL.h"
+#include "base/Log.h"
 #include "base/ZORError.h"
 #include "fs/Durability.h"
 #include "fs/ZORFileManager.h"
+#include "platform/Device.h"
 #include "platform/Errno.h"
 
+#include <cstdint>
 #include <optional>
+#include <string>
 #include <vector>
 
 namespace zor {
@@ -38,6 +45,19 @@ private:
     const Log& log_;
     const ZORFileManager& fileManager_;
     const fs::Durability& durability_;
+};
+
+class SandboxMappings {
+public:
+    SandboxMappings(const Log& log, platform::SandboxUserState& sandbox) : log_(log), sandbox_(sandbox) {}
+
+    /// Removes the mapping, then sets it when there is a URL. False, logged, on failure.
+    bool _setSandboxContainerMappingForUser(std::uint32_t userId, const std::string& identifier,
+                                            ContainerClass containerClass, const std::optional<FileURL>& url);
+
+private:
+    const Log& log_;
+    platform::SandboxUserState& sandbox_;
 };
 
 } // namespace zor

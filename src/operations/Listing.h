@@ -4,9 +4,9 @@
 
 #include "base/ContainerClass.h"
 #include "base/ZORError.h"
-#include "ipc/UUID.h"
-#include "operations/RecordNeeds.h"
-#include "store/StoreLimits.h"
+#include "ipc/Identifiers.h"
+#include "operations/Basics.h"
+#include "store/ZORContainerCache.h"
 
 #include <cstdint>
 #include <optional>

@@ -9,7 +9,7 @@
 //   5. the new one, or its copy, moves to its destination              stopped: done; staging is swept
 //   6. what waits in staging goes to death row, then the journal       stopped: done; the journal goes
 //
-// Nothing waits for the disk under the all-identifiers lock. Steps 1 to 3 run before it (ReplacePreparation.cc), and
+// Nothing waits for the disk under the all-identifiers lock. Steps 1 to 3 run before it, and
 // what they prepared counts when the containers are the same under it; else they come again. If the file system keeps
 // no order by itself, the syncs between 4, 5 and 6 run without it, and the replace is known as under way: whoever has
 // to do with one of its containers waits for its end, and nobody else.
@@ -38,12 +38,11 @@
 
 #include "base/ContainerClass.h"
 #include "base/ZORError.h"
-#include "ipc/UUID.h"
+#include "ipc/Identifiers.h"
+#include "operations/Basics.h"
 #include "operations/DeathRow.h"
 #include "operations/LastingMoves.h"
-#include "operations/RecordNeeds.h"
 #include "operations/ReplaceRecovery.h"
-#include "operations/SandboxMappings.h"
 #include "os/FileDescriptor.h"
 #include "store/ZORGlobalConfiguration.h"
 #include "store/ZORWhitelist.h"
@@ -108,7 +107,7 @@ private:
     ZORError oldNotMoved(const Progress& progress, const ZORError& cause);
     ZORError notInPlace(const Progress& progress, const ZORError& cause);
 
-    // ReplacePreparation.cc
+    // Preparation, without the lock.
     /// Without the lock. Errors 14, 15, 33, 34.
     Result<void> prepare(const ReplaceRequest& request, Prepared& prepared, bool mayExchange);
     /// Whether there is something to prepare for.

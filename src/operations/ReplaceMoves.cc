@@ -3,7 +3,7 @@
 // cleanUpReplace where the moves have to be on the disk before the journal can be gone; it runs without the lock then.
 #include "fs/ItemStatus.h"
 #include "operations/ReplaceProgress.h"
-#include "store/ContainerLayout.h"
+#include "store/StorePlaces.h"
 
 #include <cerrno>
 #include <cstdio>

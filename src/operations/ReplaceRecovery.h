@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// Replaces that stopped half-way: what a launch makes of them (ReplaceRecovery.cc), and what requests do about those
-// that still wait afterwards (SettleReplaces.cc).
+// Replaces that stopped half-way: what a launch makes of them, and what requests do about those
+// that still wait afterwards.
 //
 // A journal says where the directories of a replace were and were to go; which of them are there says how far it came.
 // Each recovery is one move at the most. A journal that cannot be settled or read stays and waits. The moves that its
@@ -16,11 +16,11 @@
 #include "base/ZORError.h"
 #include "base/ZORLocks.h"
 #include "fs/ZORFileManager.h"
-#include "ipc/UUID.h"
+#include "ipc/Identifiers.h"
 #include "operations/DeathRow.h"
 #include "operations/LastingMoves.h"
 #include "store/ReplaceJournal.h"
-#include "store/SetupReport.h"
+#include "store/SetupProgress.h"
 #include "store/ZORContainerCache.h"
 #include "store/ZORGlobalConfiguration.h"
 

@@ -4,8 +4,7 @@
 #pragma once
 
 #include "base/ZORError.h"
-#include "base/ZORException.h"
-#include "operations/Caller.h"
+#include "operations/Basics.h"
 #include "operations/Creation.h"
 #include "operations/Deletion.h"
 #include "operations/InfoValues.h"

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "operations/Structure.h"
 
-#include "store/ContainerLayout.h"
+#include "store/StorePlaces.h"
 
 #include <map>
 #include <optional>

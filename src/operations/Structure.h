@@ -14,11 +14,9 @@
 #include "base/FileURL.h"
 #include "base/ZORError.h"
 #include "fs/ZORFileManager.h"
-#include "operations/KnownContainer.h"
+#include "operations/Basics.h"
 #include "operations/LastingMoves.h"
-#include "operations/RecordNeeds.h"
 #include "operations/ReplaceRecovery.h"
-#include "operations/SandboxMappings.h"
 
 #include <vector>
 

@@ -8,8 +8,7 @@
 
 #include "base/ContainerClass.h"
 #include "base/ZORError.h"
-#include "base/ZORException.h"
-#include "operations/Caller.h"
+#include "operations/Basics.h"
 #include "operations/Creation.h"
 #include "operations/Replace.h"
 

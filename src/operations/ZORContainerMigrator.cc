@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "operations/ZORContainerMigrator.h"
 
-#include "base/UserIdentity.h"
+#include "base/ContainerClass.h"
 #include "fs/PathResolver.h"
 #include "store/Names.h"
 

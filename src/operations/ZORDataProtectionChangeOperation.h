@@ -18,8 +18,7 @@
 #include "base/ZORError.h"
 #include "fs/TreeWalker.h"
 #include "fs/ZORFileManager.h"
-#include "operations/Background.h"
-#include "operations/RecordNeeds.h"
+#include "operations/Basics.h"
 #include "store/ZORMetadata.h"
 
 #include <cstdint>

@@ -7,15 +7,15 @@
 #pragma once
 
 #include "base/ContainerClass.h"
-#include "base/ErrorCode.h"
+#include "base/Log.h"
 #include "base/Mutex.h"
 #include "base/ZORError.h"
-#include "ipc/UUID.h"
+#include "ipc/Identifiers.h"
+#include "operations/Basics.h"
 #include "operations/InfoValues.h"
-#include "operations/RecordNeeds.h"
 #include "operations/ZORDataProtectionChangeOperation.h"
 #include "platform/Device.h"
-#include "store/StoreLimits.h"
+#include "store/ZORContainerCache.h"
 
 #include <cstdint>
 #include <functional>
@@ -26,6 +26,32 @@
 #include <vector>
 
 namespace zor {
+
+// Keeps an application from running while its files are half changed: holds one assertion of the platform's service
+// from its making to `invalidate`.
+//
+// Its holder invalidates it before dropping it. One thread at a time.
+
+class ZORApplicationTerminationAssertion {
+public:
+    /// Waits until the service has granted the assertion or refused it; nullptr, logged, when there is none. `reason`
+    /// is a number of platform::TerminationReason; with any other the process ends.
+    [[nodiscard]] static std::unique_ptr<ZORApplicationTerminationAssertion>
+    initWithBundleIdentifier(const Log& log, platform::TerminationAssertionService& service,
+                             const std::string& bundleIdentifier, std::uint8_t reason);
+    ~ZORApplicationTerminationAssertion();
+    ZORApplicationTerminationAssertion(const ZORApplicationTerminationAssertion&) = delete;
+    ZORApplicationTerminationAssertion& operator=(const ZORApplicationTerminationAssertion&) = delete;
+
+    /// Gives the assertion back; once more does nothing.
+    void invalidate() { termAssertion_.reset(); }
+
+private:
+    using Handle = std::unique_ptr<platform::TerminationAssertionService::Assertion>;
+    explicit ZORApplicationTerminationAssertion(Handle handle) : termAssertion_(std::move(handle)) {}
+
+    Handle termAssertion_;
+};
 
 class ZORDataProtectionManager {
 public:

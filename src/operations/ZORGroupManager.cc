@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "operations/ZORGroupManager.h"
 
-#include "base/UserIdentity.h"
+#include "base/ContainerClass.h"
 
 #include <algorithm>
 #include <map>

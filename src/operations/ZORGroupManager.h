@@ -8,14 +8,13 @@
 
 #include "base/ContainerClass.h"
 #include "base/ZORError.h"
-#include "operations/Caller.h"
+#include "operations/Basics.h"
 #include "operations/ContainerMaker.h"
 #include "operations/ContainerRemoval.h"
 #include "operations/Creation.h"
-#include "operations/RecordNeeds.h"
 #include "operations/ReplaceRecovery.h"
 #include "store/EntitlementFile.h"
-#include "store/SetupReport.h"
+#include "store/SetupProgress.h"
 #include "store/ZOREntitlementMapping.h"
 #include "store/ZORGlobalConfiguration.h"
 

@@ -3,7 +3,7 @@
 
 #include "base/BlockingScope.h"
 #include "base/Try.h"
-#include "os/Openat2.h"
+#include "os/FileDescriptor.h"
 
 #include <cerrno>
 #include <cstdio>

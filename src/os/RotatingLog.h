@@ -16,7 +16,7 @@
 #include "os/FileDescriptor.h"
 #include "os/ServiceManager.h"
 #include "platform/Errno.h"
-#include "platform/PlatformLog.h"
+#include "platform/Process.h"
 
 #include <atomic>
 #include <cstddef>

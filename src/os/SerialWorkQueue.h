@@ -8,7 +8,7 @@
 #pragma once
 
 #include "base/Mutex.h"
-#include "platform/WorkQueue.h"
+#include "platform/Process.h"
 
 #include <deque>
 #include <string>

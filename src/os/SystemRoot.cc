@@ -2,8 +2,7 @@
 #include "os/SystemRoot.h"
 
 #include "base/Try.h"
-#include "os/Names.h"
-#include "os/Openat2.h"
+#include "os/FileDescriptor.h"
 
 #include <algorithm>
 #include <cerrno>

@@ -3,7 +3,7 @@
 #pragma once
 
 #include "platform/Errno.h"
-#include "platform/WorkQueue.h"
+#include "platform/Process.h"
 
 #include <cerrno>
 #include <cstdint>

@@ -6,10 +6,8 @@
 #include "ipc/UserNumbers.h"
 #include "platform/Device.h"
 #include "platform/Disk.h"
-#include "platform/PeerIdentity.h"
-#include "platform/PlatformLog.h"
+#include "platform/Process.h"
 #include "platform/Service.h"
-#include "platform/WorkQueue.h"
 
 namespace zor::platform {
 

@@ -2,9 +2,8 @@
 // Reads the binary form. Every place and count is compared with what the input still holds before it is used, and every
 // piece of memory is charged before it is taken: the sum of charges stays within memoryBytesMax of the input, however
 // often objects are shared. Containers being read are on a stack of at most nestingMax: meeting one again is a cycle.
-#include "plist/Binary.h"
 #include "plist/BinaryFormat.h"
-#include "plist/Errors.h"
+#include "plist/Codec.h"
 #include "plist/Text.h"
 
 #include <algorithm>

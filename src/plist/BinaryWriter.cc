@@ -4,9 +4,8 @@
 // the offset table in their final places. Objects are numbered in the order met: a container, then for each member key
 // and value. Nothing is made unique: looking for equal strings would cost more than the bytes saved in messages of this
 // size.
-#include "plist/Binary.h"
 #include "plist/BinaryFormat.h"
-#include "plist/Errors.h"
+#include "plist/Codec.h"
 #include "plist/Text.h"
 
 #include <algorithm>

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // The one-line form of a value. Its text often comes from clients, so nothing in it can end a log line or fill the log:
 // what must not be shown is escaped, and the work stops where the text is full.
-#include "plist/Errors.h"
+#include "plist/Codec.h"
 #include "plist/Text.h"
 #include "plist/Value.h"
 

@@ -3,7 +3,7 @@
 //
 // A value owns everything below it; copying copies the tree. A dictionary keeps its entries sorted by key in one flat
 // array: small (most have under ten entries), compact, compared and searched without hashing. Nothing here locks: a
-// value belongs to one thread, or is const. Depth is bounded by the readers (Errors.h), so destruction may recurse.
+// value belongs to one thread, or is const. Depth is bounded by the readers (Codec.h), so destruction may recurse.
 #pragma once
 
 #include <cstddef>

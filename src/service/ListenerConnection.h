@@ -14,20 +14,77 @@
 #pragma once
 
 #include "base/Mutex.h"
-#include "platform/PeerIdentity.h"
 #include "platform/Service.h"
-#include "service/ListenerIncidents.h"
-#include "service/ListenerInput.h"
-#include "service/ListenerOutput.h"
 #include "service/ListenerPool.h"
+#include "service/ListenerShares.h"
+#include "service/ListenerStreams.h"
 #include "service/PassedAlong.h"
 
+#include <array>
 #include <atomic>
 #include <chrono>
+#include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <span>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+namespace zor::platform {
+
+// Everything that goes wrong on connections, counted, and told to the keeper of the log: of each kind a line now and
+// then, so that clients cannot fill it. Any thread.
+
+enum class ListenerIncident : std::uint8_t {
+    /// A connection was closed at once: the user, or the listener, has as many as it may.
+    tooManyConnections,
+    /// A connection was closed at once: the process is out of descriptors or memory.
+    outOfDescriptors,
+    /// The kernel does not say who connected.
+    unknownPeer,
+    /// Bytes came from another process than the one that connected.
+    foreignSender,
+    /// Something that is no request.
+    brokenFrame,
+    /// More of requests was buffered than the user may have buffered.
+    tooMuchInput,
+    /// A peer left more of its replies unread than is kept.
+    tooMuchOutput,
+    /// A reply that cannot be written: a fault of the daemon, or it has no memory for it.
+    unwritableReply,
+    /// A request could not be served to its end, mostly for want of memory.
+    unservable,
+};
+inline constexpr std::size_t listenerIncidentKinds = 9;
+
+/// Gets a line for the log. Any thread, one call at a time for each kind.
+using ListenerReport = std::function<void(std::string_view line)>;
+
+class ListenerIncidents {
+public:
+    ListenerIncidents(ListenerReport report, std::chrono::seconds lineEvery)
+        : report_(std::move(report)), lineEvery_(lineEvery) {}
+    /// `about` is the uid or the pid that the incident is about, `request` the client's number of the request whose
+    /// reply is meant. Without memory the line is left out, not the count.
+    void happened(ListenerIncident incident, std::int64_t about, std::uint64_t request = 0) noexcept;
+    [[nodiscard]] std::uint64_t count(ListenerIncident incident) const;
+
+private:
+    struct Kind {
+        std::atomic<std::uint64_t> count{0};
+        std::atomic<std::uint64_t> countTold{0};
+        /// A time of the steady clock.
+        std::atomic<std::int64_t> tellFromSeconds{0};
+    };
+    const ListenerReport report_;
+    const std::chrono::seconds lineEvery_;
+    std::array<Kind, listenerIncidentKinds> kinds_;
+};
+
+} // namespace zor::platform
 
 namespace zor::ipc {
 struct FrameHeader;
@@ -128,6 +185,31 @@ private:
     std::uint64_t life_ ZOR_GUARDED_BY(mutex_) = 0;
     /// pendingBytes() may be read without the mutex.
     ListenerOutput output_;
+};
+
+// The state that the connections of one listener share. It outlives them while they are open.
+
+struct ListenerCore {
+    ListenerCore(const ListenerLimits& theLimits, ListenerReport report)
+        : limits(theLimits), charges(theLimits), incidents(std::move(report), theLimits.incidentLineEvery),
+          pool(theLimits) {}
+
+    [[nodiscard]] std::shared_ptr<ListenerConnection> unusedConnection() ZOR_EXCLUDES(mutex);
+    /// The connection has ended and its object may be used for another.
+    void recycle(ListenerConnection& connection) ZOR_EXCLUDES(mutex);
+
+    const ListenerLimits limits;
+    ServiceHandler handler;
+    ListenerCharges charges;
+    ListenerIncidents incidents;
+    std::atomic<std::uint64_t> accepted{0};
+
+    Mutex mutex;
+    std::vector<std::shared_ptr<ListenerConnection>> connections ZOR_GUARDED_BY(mutex);
+    std::vector<ListenerConnection*> unused ZOR_GUARDED_BY(mutex);
+
+    /// Last: its threads use all of the above.
+    ListenerPool pool;
 };
 
 } // namespace zor::platform

@@ -13,7 +13,7 @@
 //   - whenever fewer are active than may run, at least one is waiting, or the pool has threadsMax threads: so work that
 //     arrives is always seen by somebody. Whoever makes "nobody waits" or "fewer are active" true looks at the other
 //     and adds a worker; both counters are sequentially consistent, so one of two that meet sees it;
-//   - an event wakes one worker, and whoever leaves tasks waiting for their turn (ListenerTurns.h) wakes one that has
+//   - an event wakes one worker, and whoever leaves tasks waiting for their turn (ListenerShares.h) wakes one that has
 //     nothing to do. A task may be called for an event that is out of date, or while another worker has it: it has to
 //     tell that itself.
 // The watcher is a thread that ticks while nobody waits, and until no receive is under way, and else sleeps without a
@@ -24,8 +24,7 @@
 #include "base/BlockingScope.h"
 #include "base/Mutex.h"
 #include "os/FileDescriptor.h"
-#include "service/ListenerLimits.h"
-#include "service/ListenerTurns.h"
+#include "service/ListenerShares.h"
 #include "service/PassedAlong.h"
 
 #include <atomic>

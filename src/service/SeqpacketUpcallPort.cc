@@ -2,8 +2,8 @@
 #include "service/SeqpacketUpcallPort.h"
 
 #include "base/Try.h"
-#include "os/Names.h"
 #include "os/RunLoop.h"
+#include "os/SystemRoot.h"
 
 #include <algorithm>
 #include <cerrno>

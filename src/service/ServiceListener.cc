@@ -2,7 +2,7 @@
 #include "service/ServiceListener.h"
 
 #include "base/Try.h"
-#include "service/ListenerCore.h"
+#include "service/ListenerConnection.h"
 
 #include <cerrno>
 #include <chrono>

@@ -2,7 +2,7 @@
 // The named service on a stream socket: accepts connections and has an elastic pool of threads serve them.
 //
 // The thread that finds a connection readable reads the frames, calls the handler and sends the reply itself. Memory
-// and connections are bounded (ListenerLimits.h); no peer can make a thread wait.
+// and connections are bounded (ListenerShares.h); no peer can make a thread wait.
 //
 // ListenerSocket        who gets in                   ListenerConnection   one peer: frames in, replies out
 // ListenerPool          the threads, one epoll      ListenerInput/Output its buffers
@@ -12,10 +12,9 @@
 #pragma once
 
 #include "platform/Errno.h"
-#include "platform/PeerIdentity.h"
 #include "platform/Service.h"
-#include "service/ListenerIncidents.h"
-#include "service/ListenerLimits.h"
+#include "service/ListenerConnection.h"
+#include "service/ListenerShares.h"
 #include "service/ListenerSocket.h"
 
 #include <cstdint>

@@ -3,7 +3,7 @@
 
 #include "base/Try.h"
 #include "ipc/Frame.h"
-#include "plist/Binary.h"
+#include "plist/Codec.h"
 
 #include <cerrno>
 #include <ctime>

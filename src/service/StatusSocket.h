@@ -8,7 +8,7 @@
 
 #include "os/RunLoop.h"
 #include "platform/Errno.h"
-#include "platform/PeerIdentity.h"
+#include "platform/Service.h"
 #include "plist/Value.h"
 #include "service/ListenerSocket.h"
 

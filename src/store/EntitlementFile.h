@@ -4,7 +4,7 @@
 
 #include "base/ZORError.h"
 #include "fs/ZORFileManager.h"
-#include "ipc/Keys.h"
+#include "ipc/Protocol.h"
 #include "plist/Value.h"
 
 #include <cstddef>

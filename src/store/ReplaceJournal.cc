@@ -2,7 +2,7 @@
 #include "store/ReplaceJournal.h"
 
 #include "base/BlockingScope.h"
-#include "fs/DictionaryFile.h"
+#include "fs/AtomicFile.h"
 
 #include <algorithm>
 #include <array>

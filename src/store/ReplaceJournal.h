@@ -10,7 +10,7 @@
 #include "base/Mutex.h"
 #include "base/ZORError.h"
 #include "fs/ZORFileManager.h"
-#include "ipc/UUID.h"
+#include "ipc/Identifiers.h"
 
 #include <array>
 #include <atomic>

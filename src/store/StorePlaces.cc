@@ -1,8 +1,14 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/StorePlaces.h"
 
+#include "base/Assert.h"
 #include "fs/ZORFileManager.h"
+#include "os/FileDescriptor.h"
+#include "os/SystemRoot.h"
 #include "store/Names.h"
+
+#include <cerrno>
+#include <fcntl.h>
 
 namespace zor {
 
@@ -101,6 +107,67 @@ std::optional<FileURL> StorePlaces::baseOfClass(ContainerClass containerClass, b
     if (!userHome)
         return std::nullopt;
     return transient ? userTransientDirectory(*userHome) : userBaseDirectory(*userHome);
+}
+
+namespace {
+
+bool isMissing(const platform::SystemRoot& root, const std::string& path, int flags) {
+    const auto opened = platform::openInRoot(root.descriptor(), path.c_str(), O_PATH | flags);
+    return !opened && (opened.error() == ENOENT || opened.error() == ENOTDIR);
+}
+
+} // namespace
+
+std::vector<std::string> missingOf(const platform::SystemRoot& root) {
+    std::vector<std::string> missing;
+    if (!root.isDeviceRoot() && isMissing(root, platform::names::passwordFile, 0))
+        missing.emplace_back(platform::names::passwordFile);
+    for (const RootDirectory& directory : rootDirectories)
+        if (std::string path(directory.path); isMissing(root, path, O_DIRECTORY))
+            missing.push_back(std::move(path));
+    return missing;
+}
+
+std::string initCommand(const platform::SystemRoot& root) {
+    return root.isDeviceRoot() ? "zorvanectl init" : "zorvanectl init --root " + root.canonicalPath();
+}
+
+std::string lineAboutMissing(const platform::SystemRoot& root, const std::vector<std::string>& missing) {
+    std::string names;
+    for (const std::string& path : missing)
+        names += (names.empty() ? "" : ", ") + path;
+    return "the root " + root.canonicalPath() + " lacks " + names + "; make what it has to hold: " + initCommand(root);
+}
+
+namespace {
+constexpr const char* dataSubdirectories[] = {"Documents", "Library", "Library/Caches", "Library/Preferences",
+                                              names::containerTemporary};
+constexpr const char* groupSubdirectories[] = {"Library", "Library/Caches"};
+} // namespace
+
+ContainerLayout layoutOf(ContainerClass containerClass, std::uint32_t userId) {
+    ZOR_ASSERT(isValidClass(containerClass));
+    ContainerLayout layout;
+    if (isBundleClass(containerClass)) {
+        layout.topLevelOwner = userId;
+        return layout;
+    }
+    const bool group =
+        containerClass == ContainerClass::sharedAppGroup || containerClass == ContainerClass::sharedSystemGroup;
+    layout.subdirectories =
+        group ? std::span<const char* const>(groupSubdirectories) : std::span<const char* const>(dataSubdirectories);
+    if (isSystemClass(containerClass)) {
+        layout.subdirectoryMode = 0777; // services of several users work in them
+    } else {
+        layout.subdirectoryOwner = userId;
+        layout.topLevelOwner = userId;
+    }
+    return layout;
+}
+
+std::optional<std::uint32_t> topLevelOwnerOf(ContainerClass containerClass, std::uint32_t userId) {
+    const std::uint32_t owner = layoutOf(containerClass, userId).topLevelOwner;
+    return owner == ownerUnchanged ? std::nullopt : std::optional(owner);
 }
 
 } // namespace zor

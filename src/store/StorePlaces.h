@@ -9,8 +9,15 @@
 #include "base/ContainerClass.h"
 #include "base/FileURL.h"
 #include "fs/PathResolver.h"
+#include "fs/ZORFileManager.h"
+#include "os/SystemRoot.h"
 
+#include <array>
 #include <optional>
+#include <span>
+#include <string>
+#include <string_view>
+#include <sys/types.h>
 #include <vector>
 
 namespace zor {
@@ -64,5 +71,49 @@ private:
     const FileURL temporaryDirectory_;
     const FileURL formerContainersDirectory_;
 };
+
+// The things that a system root has to hold before a daemon can serve it, and which the daemon does not make: it
+// belongs to whoever builds the device. Immutable; any thread.
+
+struct RootDirectory {
+    std::string_view path; // from the root, without a leading slash
+    mode_t mode;
+    /// Belongs to the installer, else to root.
+    bool isInstallers;
+};
+
+/// Parents before children.
+inline constexpr std::array<RootDirectory, 4> rootDirectories = {{
+    {"private", 0755, false},
+    {"private/var", 0755, false},
+    {"private/var/brevad", 0755, true},
+    {"tmp", 01777, false},
+}};
+
+/// Those of them, and the user database, that are not there. An entry that cannot be looked at counts as there: the
+/// daemon says later what it failed on.
+[[nodiscard]] std::vector<std::string> missingOf(const platform::SystemRoot& root);
+/// One line about them, with the command that makes them.
+[[nodiscard]] std::string lineAboutMissing(const platform::SystemRoot& root, const std::vector<std::string>& missing);
+/// That command.
+[[nodiscard]] std::string initCommand(const platform::SystemRoot& root);
+
+// The inside of a container of each class: its standard subdirectories, their mode and owner.
+
+struct ContainerLayout {
+    /// Relative to the container, parents before children; NUL-terminated.
+    std::span<const char* const> subdirectories;
+    mode_t subdirectoryMode = 0755;
+    std::uint32_t subdirectoryOwner = ownerUnchanged;
+    mode_t topLevelMode = 0755;
+    std::uint32_t topLevelOwner = ownerUnchanged;
+    int topLevelProtectionClass = 0;
+};
+
+/// The layout of a valid class for a container of `userId`.
+[[nodiscard]] ContainerLayout layoutOf(ContainerClass containerClass, std::uint32_t userId);
+
+/// The user whose a container's directory is. Absent: nobody but root can put anything in its place.
+[[nodiscard]] std::optional<std::uint32_t> topLevelOwnerOf(ContainerClass containerClass, std::uint32_t userId);
 
 } // namespace zor

@@ -1,18 +1,161 @@
 // SPDX-License-Identifier: Apache-2.0
 // The class directories as the cache reads them: for all that need one by one thread, without the mutex.
 #include "base/BlockingScope.h"
-#include "store/ClassDirectoryReader.h"
+#include "base/Mutex.h"
+#include "fs/ItemStatus.h"
+#include "fs/PathResolver.h"
+#include "fs/SharedWork.h"
 #include "store/ZORContainerCache.h"
+#include "store/ZORMetadata.h"
 
 #include <cerrno>
 #include <exception>
+#include <functional>
+#include <iterator>
+#include <map>
+#include <memory>
+#include <optional>
 #include <set>
+#include <string>
+#include <vector>
 
 namespace zor {
 
 using platform::MutexLock;
 
 namespace {
+
+// Reads the metadata of every container in a class directory.
+//
+// Reading is one open, one fstat, one read and one close an entry. In a large directory a second thread takes every
+// other stretch of entries: when the directory is not in memory, two reads are under way at the disk instead of one,
+// and when it is, two processors parse. Each record is handed over in the directory's order all the same, so that of
+// two containers with one identifier the later listed counts.
+
+class ClassDirectoryReader {
+public:
+    ClassDirectoryReader(const Log& log, ZORFileManager& fileManager, FileURL directory, std::uint32_t userId)
+        : log_(log), fileManager_(fileManager), directory_(std::move(directory)), userId_(userId) {}
+
+    /// Calls `found` for each valid container, on this thread; what is not valid is logged and left out. Fails with the
+    /// listing's error, ENOKEY where an encryption hides the names, and `found` is then not called.
+    Result<void> forEach(const std::function<void(std::shared_ptr<ZORMetadata>)>& found);
+    /// Whether an entry of the last listing may be a container that an encryption hides.
+    [[nodiscard]] bool metHidden() const { return metHidden_; }
+
+private:
+    const Log& log_;
+    ZORFileManager& fileManager_;
+    const FileURL directory_;
+    const std::uint32_t userId_;
+    bool metHidden_ = false;
+};
+
+/// The number of a directory's entries that are no containers and are told one by one: a user may have filled it with
+/// any number.
+constexpr std::size_t refusalsSaidMax = 200;
+
+/// The entries that could not be read as containers. Any thread.
+class Refusals {
+public:
+    void add(std::size_t index, ZORError error) {
+        const ZORError* const cause = error.underlying();
+        const MutexLock held(mutex_);
+        ++count_;
+        if (cause && cause->isOwnShortage())
+            shortage_ = Errno(cause->code());
+        isHidden_ = isHidden_ || (cause && cause->isPosix(ENOKEY));
+        first_.emplace(index, std::move(error));
+        if (first_.size() > refusalsSaidMax)
+            first_.erase(std::prev(first_.end()));
+    }
+    /// In the directory's order.
+    void say(const Log& log, const FileURL& directory) {
+        const MutexLock held(mutex_);
+        for (const auto& [index, error] : first_)
+            logError(log, error);
+        if (count_ > first_.size())
+            log.write(logLevelError, "readAndValidateMetadataAtUrl", "%llu more entries of %s are no containers",
+                      static_cast<unsigned long long>(count_ - first_.size()), directory.c_str());
+    }
+    /// That this process was short of descriptors or memory.
+    Errno shortage() {
+        const MutexLock held(mutex_);
+        return shortage_;
+    }
+    [[nodiscard]] bool isHidden() {
+        const MutexLock held(mutex_);
+        return isHidden_;
+    }
+
+private:
+    platform::Mutex mutex_;
+    std::uint64_t count_ ZOR_GUARDED_BY(mutex_) = 0;
+    std::map<std::size_t, ZORError> first_ ZOR_GUARDED_BY(mutex_);
+    Errno shortage_ ZOR_GUARDED_BY(mutex_);
+    bool isHidden_ ZOR_GUARDED_BY(mutex_) = false;
+};
+
+/// The names of a directory in one block of memory, each NUL-terminated.
+struct Names {
+    std::string bytes;
+    std::vector<std::uint32_t> starts;
+    void add(const char* name, std::size_t length) {
+        starts.push_back(static_cast<std::uint32_t>(bytes.size()));
+        bytes.append(name, length + 1);
+    }
+    [[nodiscard]] const char* at(std::size_t index) const { return bytes.data() + starts[index]; }
+};
+
+Result<void> ClassDirectoryReader::forEach(const std::function<void(std::shared_ptr<ZORMetadata>)>& found) {
+    const auto failed = [&](Errno error) {
+        return posixError({"urlsForItemsInDirectoryAtURL", __LINE__}, error, "_IterateDirectory for %s returned %s",
+                          directory_.c_str(), error.text());
+    };
+    const auto directory = fileManager_.resolver().openDirectory(directory_);
+    platform::Disk& disk = fileManager_.disk();
+    const bool hidden = directory
+                            ? disk.hidesNames(directory->get())
+                            : directory.error() == ENOENT && fs::hiddenBy(fileManager_.resolver(), disk, directory_);
+    if (!directory || hidden) {
+        const Errno error = hidden ? Errno(ENOKEY) : directory.error();
+        if (error != ENOENT)
+            log_.write(logLevelError, "_IterateDirectory", "opendir of %s failed: %s", directory_.c_str(),
+                       error.text());
+        return failed(error);
+    }
+    Names names;
+    fs::BulkDirectoryRead::Buffer buffer;
+    fs::BulkDirectoryRead entries(directory->get(), buffer);
+    while (const auto* entry = entries.next())
+        if (entry->name[0] != '.')
+            names.add(entry->name, entry->nameBytes);
+    if (entries.error())
+        return failed(entries.error());
+
+    const MetadataReader reader(disk, directory->get(), std::make_shared<const std::string>(directory_.path()), userId_,
+                                CheckClassPath::yes);
+    std::vector<std::shared_ptr<ZORMetadata>> records(names.starts.size());
+    Refusals refusals;
+    fs::forEachStretch(records.size(), [&](std::size_t begin, std::size_t end) {
+        for (std::size_t i = begin; i < end; ++i) {
+            auto record = reader.read(names.at(i));
+            if (record)
+                records[i] = std::move(*record);
+            else
+                refusals.add(i, std::move(record).error());
+        }
+    });
+    refusals.say(log_, directory_);
+    metHidden_ = refusals.isHidden();
+    // An entry that this process could not look at may be a container. Taken for none, it would get a double.
+    if (const Errno shortage = refusals.shortage())
+        return failed(shortage);
+    for (auto& record : records)
+        if (record)
+            found(std::move(record));
+    return {};
+}
 
 /// A look over a class directory after something has gone from it takes at most a hundredth of the time, and comes at
 /// most once a second: who owns the directory can make it necessary again and again.

@@ -3,9 +3,9 @@
 
 #include "base/Assert.h"
 #include "base/BlockingScope.h"
-#include "base/UserIdentity.h"
-#include "fs/DictionaryFile.h"
-#include "ipc/Keys.h"
+#include "base/ContainerClass.h"
+#include "fs/AtomicFile.h"
+#include "ipc/Protocol.h"
 #include "plist/Value.h"
 #include "store/Names.h"
 

@@ -20,7 +20,7 @@
 #include "base/ZORLocks.h"
 #include "plist/Value.h"
 #include "store/EntitlementFile.h"
-#include "store/MigrationMarkers.h"
+#include "store/SetupProgress.h"
 #include "store/ZORGlobalConfiguration.h"
 
 #include <array>

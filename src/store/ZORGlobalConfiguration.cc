@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ZORGlobalConfiguration.h"
 
-#include "ipc/ContainerClasses.h"
+#include "ipc/Protocol.h"
 #include "store/Names.h"
 
 #include <algorithm>

@@ -15,7 +15,6 @@
 #include "ipc/UserNumbers.h"
 #include "platform/Device.h"
 #include "store/StorePlaces.h"
-#include "store/UserHome.h"
 #include "store/ZORPerUserConfiguration.h"
 
 #include <array>

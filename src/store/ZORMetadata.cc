@@ -2,12 +2,10 @@
 #include "store/ZORMetadata.h"
 
 #include "fs/AtomicFile.h"
-#include "fs/DictionaryFile.h"
 #include "fs/PathResolver.h"
-#include "ipc/Identifier.h"
-#include "ipc/Keys.h"
-#include "plist/Binary.h"
-#include "plist/Read.h"
+#include "ipc/Identifiers.h"
+#include "ipc/Protocol.h"
+#include "plist/Codec.h"
 #include "store/Names.h"
 
 #include <bit>

@@ -12,7 +12,7 @@
 #include "base/FileURL.h"
 #include "base/ZORError.h"
 #include "fs/ZORFileManager.h"
-#include "ipc/UUID.h"
+#include "ipc/Identifiers.h"
 #include "plist/Value.h"
 
 #include <array>

@@ -2,9 +2,8 @@
 #include "store/ZORWhitelist.h"
 
 #include "fs/AtomicFile.h"
-#include "fs/DictionaryFile.h"
-#include "ipc/UUID.h"
-#include "os/Names.h"
+#include "ipc/Identifiers.h"
+#include "os/SystemRoot.h"
 
 #include <algorithm>
 #include <cerrno>

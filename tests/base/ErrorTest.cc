@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // Error values and their one line, the level gate, the boundary where exceptions end, names that are encoded.
 #include "base/Format.h"
-#include "base/ZORException.h"
+#include "base/ZORError.h"
 #include "device/FileCrashAnnotation.h"
-#include "os/Names.h"
+#include "os/SystemRoot.h"
 #include "support/RecordingLog.h"
 #include "support/SettableRoles.h"
 #include "support/TestRoot.h"

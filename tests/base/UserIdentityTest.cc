@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // Whose containers a request may act on, as a table; the lookup of the mobile user by many threads at once.
-#include "base/UserIdentity.h"
+#include "base/ContainerClass.h"
 #include "support/RecordingLog.h"
 #include "support/Waiting.h"
 

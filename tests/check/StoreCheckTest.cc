@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "check/StoreCheck.h"
-#include "check/Repair.h"
+#include "check/Finding.h"
 #include "store/EntitlementFile.h"
 #include "support/EncryptedDisk.h"
 #include "support/FileTree.h"

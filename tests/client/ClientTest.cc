@@ -1,9 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "zorvane/Client.h"
-#include "ipc/ContainerClasses.h"
 #include "ipc/Frame.h"
-#include "ipc/Keys.h"
-#include "ipc/UUID.h"
+#include "ipc/Identifiers.h"
+#include "ipc/Protocol.h"
 #include "support/FakeServer.h"
 #include "support/Frames.h"
 #include "zorvane/Text.h"

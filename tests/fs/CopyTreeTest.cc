@@ -2,7 +2,7 @@
 // Goal: a copy has everything that the original has and is meant to be copied, takes nothing from outside the tree, and
 // is never called a success when it is not whole. Method: a table over the kinds of items, compared between and within
 // two file systems; an owner who swaps the destination.
-#include "fs/RecursiveCopy.h"
+#include "fs/Trees.h"
 
 #include "fs/TreeWorld.h"
 

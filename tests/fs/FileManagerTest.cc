@@ -4,7 +4,6 @@
 // and ownership of trees.
 #include "device/XattrProtectionClass.h"
 #include "fs/AtomicFile.h"
-#include "fs/DictionaryFile.h"
 #include "fs/Names.h"
 #include "fs/ZORFileManager.h"
 #include "support/FaultDisk.h"

@@ -1,10 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // Every operation on trees, walk, copy, removal and usage, against hostile trees: a tree's owner moves its directories
 // about meanwhile; a tree is deeper than descriptors and paths reach, and wider than memory is spent for.
-#include "fs/DiskUsage.h"
-#include "fs/RecursiveCopy.h"
 #include "fs/TreeWalker.h"
 #include "fs/TreeWorld.h"
+#include "fs/Trees.h"
 
 namespace zor::fs::test {
 namespace {

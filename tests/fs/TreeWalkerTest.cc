@@ -3,8 +3,8 @@
 // Method: real trees, moved about between two visits by the visitor itself. The same for the usage, which is a walk.
 #include "fs/TreeWalker.h"
 
-#include "fs/DiskUsage.h"
 #include "fs/TreeWorld.h"
+#include "fs/Trees.h"
 
 #include <sys/mount.h>
 

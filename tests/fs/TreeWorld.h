@@ -3,7 +3,7 @@
 // change, and an owner of the tree who moves it about meanwhile.
 #pragma once
 
-#include "fs/RecursiveRemove.h"
+#include "fs/Trees.h"
 #include "os/LinuxDisk.h"
 #include "support/FaultDisk.h"
 #include "support/FileTree.h"

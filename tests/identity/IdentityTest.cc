@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // Peers are real processes that run copies of real programs; the registry is files in a root of the test's own.
-#include "identity/IdentityFile.h"
-#include "identity/LinuxPasswordDatabase.h"
-#include "identity/LinuxPeerIdentity.h"
+#include "identity/LinuxPeer.h"
 #include "identity/PeerProcess.h"
+#include "identity/RegistryFiles.h"
+#include "identity/Users.h"
 #include "os/RunLoop.h"
 #include "service/SeqpacketUpcallPort.h"
 #include "support/Files.h"

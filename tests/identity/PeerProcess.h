@@ -2,8 +2,8 @@
 // Real processes that connect to a socket, and the registry that they are judged by.
 #pragma once
 
-#include "identity/LinuxPeerIdentity.h"
-#include "os/Names.h"
+#include "identity/LinuxPeer.h"
+#include "os/SystemRoot.h"
 #include "support/FewDescriptors.h"
 #include "support/RecordingLog.h"
 #include "support/TestRoot.h"

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "ipc/Frame.h"
-#include "ipc/Keys.h"
-#include "ipc/UUID.h"
+#include "ipc/Identifiers.h"
+#include "ipc/Protocol.h"
 
 #include <gtest/gtest.h>
 

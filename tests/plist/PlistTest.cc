@@ -1,8 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Property lists: values, the bytes of the binary form (derived by hand, read and written), the XML form, and bytes of
 // both that want to crash the reader, keep it busy or fill the memory.
-#include "plist/Binary.h"
-#include "plist/Read.h"
+#include "plist/Codec.h"
 #include "support/Allocations.h"
 
 #include <cmath>

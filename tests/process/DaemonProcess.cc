@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "process/DaemonProcess.h"
 
-#include "device/SemaphoreBootMarker.h"
+#include "device/DeviceQueries.h"
 #include "os/SystemRoot.h"
 #include "support/TestRoot.h"
 

@@ -3,7 +3,7 @@
 // dying daemon to its clients, and one of another version.
 #pragma once
 
-#include "ipc/Keys.h"
+#include "ipc/Protocol.h"
 #include "process/DaemonProcess.h"
 #include "support/FakeServer.h"
 

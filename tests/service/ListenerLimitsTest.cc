@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "service/ListenerLimits.h"
 #include "service/ListenerPool.h"
+#include "service/ListenerShares.h"
 #include "service/ListenerWorld.h"
 #include "support/Allocations.h"
 

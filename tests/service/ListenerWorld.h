@@ -4,7 +4,7 @@
 #pragma once
 
 #include "base/BlockingScope.h"
-#include "plist/Binary.h"
+#include "plist/Codec.h"
 #include "service/ServiceListener.h"
 #include "support/FewDescriptors.h"
 #include "support/FileTree.h"

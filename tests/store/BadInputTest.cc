@@ -2,7 +2,7 @@
 // Goal: whatever stands in a request in the place of what is meant, the command answers with its code and the disk
 // stays as it was. Method: a good request for each command; every key in turn absent, of every other type and out of
 // range, the whole tree compared; then the good one.
-#include "ipc/Identifier.h"
+#include "ipc/Identifiers.h"
 #include "store/DispatchFixture.h"
 
 namespace zor::test {

@@ -2,7 +2,7 @@
 // Messages to the dispatcher of a world, from a peer whose identity is in the test's hand.
 #pragma once
 
-#include "base/EntitlementKeys.h"
+#include "platform/Service.h"
 #include "world/World.h"
 
 #include <gtest/gtest.h>

@@ -3,7 +3,7 @@
 // or hung up on.
 #pragma once
 
-#include "ipc/Names.h"
+#include "ipc/Protocol.h"
 #include "support/FileTree.h"
 #include "support/Files.h"
 #include "support/Frames.h"

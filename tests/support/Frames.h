@@ -3,7 +3,7 @@
 #pragma once
 
 #include "ipc/Frame.h"
-#include "plist/Binary.h"
+#include "plist/Codec.h"
 
 #include <cstring>
 #include <optional>

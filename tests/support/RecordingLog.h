@@ -4,7 +4,7 @@
 
 #include "base/Log.h"
 #include "base/Mutex.h"
-#include "platform/PlatformLog.h"
+#include "platform/Process.h"
 
 #include <algorithm>
 #include <atomic>

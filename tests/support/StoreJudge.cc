@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "support/StoreJudge.h"
 
-#include "plist/Read.h"
+#include "plist/Codec.h"
 
 #include <algorithm>
 #include <array>

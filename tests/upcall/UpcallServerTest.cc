@@ -1,7 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "upcall/UpcallServer.h"
 
-#include "upcall/ProcessContainers.h"
 #include "upcall/UpcallWorld.h"
 
 #include <sys/wait.h>

@@ -4,8 +4,8 @@
 #pragma once
 
 #include "daemon/Daemon.h"
-#include "ipc/Names.h"
-#include "os/Names.h"
+#include "ipc/Protocol.h"
+#include "os/SystemRoot.h"
 #include "support/Frames.h"
 #include "upcall/PackbuffWorld.h"
 #include "world/World.h"

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // A root from nothing to its first containers, and one whose users have numbers of its own: what daemon, tool, library
 // and check make of it.
-#include "device/SemaphoreBootMarker.h"
+#include "device/DeviceQueries.h"
 #include "os/SystemRoot.h"
 #include "process/DaemonProcess.h"
 #include "support/FileTree.h"

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "world/World.h"
 
-#include "plist/Binary.h"
+#include "plist/Codec.h"
 
 #include <sched.h>
 #include <stdexcept>

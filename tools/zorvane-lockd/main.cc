@@ -5,7 +5,7 @@
 // A kill leaves the state that was told last. The service manager starts this program again, and the first thing that
 // it then does is to tell what is so.
 #include "Sessions.h"
-#include "ipc/Names.h"
+#include "ipc/Protocol.h"
 #include "os/FileDescriptor.h"
 #include "platform/Device.h"
 

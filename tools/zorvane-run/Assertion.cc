@@ -2,8 +2,8 @@
 #include "Assertion.h"
 
 #include "base/Format.h"
-#include "ipc/Names.h"
-#include "os/Openat2.h"
+#include "ipc/Protocol.h"
+#include "os/FileDescriptor.h"
 #include "platform/Device.h"
 
 #include <cerrno>

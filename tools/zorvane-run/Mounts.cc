@@ -3,7 +3,7 @@
 
 #include "base/Try.h"
 #include "fs/MountFences.h"
-#include "os/Openat2.h"
+#include "os/FileDescriptor.h"
 #include "zorvane/Client.h"
 
 #include <algorithm>

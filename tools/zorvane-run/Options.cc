@@ -2,7 +2,7 @@
 #include "Options.h"
 
 #include "Failure.h"
-#include "identity/UserConfiguration.h"
+#include "identity/Users.h"
 
 #include <getopt.h>
 

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "ToldContainers.h"
 
-#include "ipc/ContainerClasses.h"
+#include "ipc/Protocol.h"
 #include "upcall/packbuff/Packbuff.h"
 
 #include <algorithm>

@@ -2,8 +2,8 @@
 #include "Upcall.h"
 
 #include "base/Try.h"
-#include "ipc/Names.h"
-#include "os/Openat2.h"
+#include "ipc/Protocol.h"
+#include "os/FileDescriptor.h"
 
 #include <algorithm>
 #include <cerrno>

@@ -3,7 +3,7 @@
 // none to start; only a repair talks to it.
 #include "Commands.h"
 #include "PendingChanges.h"
-#include "check/Repair.h"
+#include "check/Finding.h"
 #include "check/StoreCheck.h"
 
 #include <algorithm>

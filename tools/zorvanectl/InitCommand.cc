@@ -7,13 +7,11 @@
 #include "Commands.h"
 #include "base/Try.h"
 #include "fs/AtomicFile.h"
-#include "identity/LinuxPasswordDatabase.h"
-#include "identity/UserConfiguration.h"
+#include "identity/Users.h"
+#include "os/FileDescriptor.h"
 #include "os/LinuxDisk.h"
-#include "os/Names.h"
-#include "os/Openat2.h"
 #include "os/SystemRoot.h"
-#include "store/RootNeeds.h"
+#include "store/StorePlaces.h"
 
 #include <array>
 #include <cerrno>

@@ -7,8 +7,6 @@
 #include "device/FileDeviceLockState.h"
 #include "device/XattrProtectionClass.h"
 #include "os/FileDescriptor.h"
-#include "os/Names.h"
-#include "os/Openat2.h"
 #include "os/SystemRoot.h"
 
 #include <cerrno>

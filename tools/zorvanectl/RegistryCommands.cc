@@ -6,8 +6,6 @@
 #include "identity/RegistryReport.h"
 #include "ipc/UserNumbers.h"
 #include "os/FileDescriptor.h"
-#include "os/Names.h"
-#include "os/Openat2.h"
 #include "os/SystemRoot.h"
 #include "plist/Value.h"
 

@@ -3,8 +3,8 @@
 #include "Commands.h"
 #include "ContainerLists.h"
 #include "RegisteredEntitlements.h"
-#include "check/CheckedSystem.h"
-#include "check/WorkCheck.h"
+#include "check/Checks.h"
+#include "check/StoreCheck.h"
 
 #include <algorithm>
 #include <array>

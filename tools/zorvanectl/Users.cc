@@ -1,8 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Users.h"
 
-#include "identity/LinuxPasswordDatabase.h"
-#include "identity/UserConfiguration.h"
+#include "identity/Users.h"
 #include "os/SystemRoot.h"
 #include "zorvane/Client.h"
 

@@ -4,8 +4,84 @@
 #pragma once
 
 #include "daemon/CommandTable.h"
+#include "ipc/Identifiers.h"
+
+#include <cstdint>
+#include <optional>
+#include <string>
 
 namespace zor::commands {
+
+// Reading a request: what is missing or of another type is absent.
+
+[[nodiscard]] inline ContainerClass classOf(const plist::Dictionary& request, std::string_view key) {
+    return static_cast<ContainerClass>(request.unsignedInteger(key).value_or(0));
+}
+
+/// "Identifier", or the client's own when the request has none. nullptr when neither is there.
+[[nodiscard]] inline const std::string* ownIdentifierByDefault(const CommandContext& context) {
+    if (const std::string* identifier = context.request.string(ipc::keys::identifier))
+        return identifier;
+    const auto& own = context.client->clientBundleIdentifier();
+    return own ? &*own : nullptr;
+}
+
+/// The same for who may be fenced in to its own identifier. False, logged, for another one: the context has its error.
+[[nodiscard]] inline bool mayAskFor(CommandContext& context, const std::string* identifier) {
+    const auto& own = context.client->clientBundleIdentifier();
+    if (!context.client->onlyOwnIdentifier() || !identifier || (own && *identifier == *own))
+        return true;
+    makeError(context.log, ZOR_HERE, ErrorCode::notEntitled, nullptr, LogFlag::yes,
+              "%s may ask for its own identifier only, not for %s (\"OnlyOwnIdentifier\" in its registry entry)",
+              ZOR_SHOWN(own), ZOR_SHOWN(*identifier));
+    context.error = ErrorCode::notEntitled;
+    return false;
+}
+
+/// The user that stands for `requested` (its low 32 bits count). Without one the context has its error.
+[[nodiscard]] inline std::optional<std::uint32_t> validatedUser(CommandContext& context, std::uint64_t requested,
+                                                                ContainerClass containerClass) {
+    const auto resolved = context.users.validateUserId(static_cast<std::uint32_t>(requested), containerClass,
+                                                       context.client->clientUserId());
+    if (resolved && isPerUserClass(containerClass) && !context.operations.configuration.homeAnswers(*resolved)) {
+        // Before the request takes any lock. A home that would stop it there would stop everybody.
+        context.error = ErrorCode::cacheNotRebuilt;
+        return std::nullopt;
+    }
+    if (resolved)
+        return *resolved;
+    context.error = resolved.error().replyCode();
+    return std::nullopt;
+}
+
+/// The user that the request acts on. Without one the context has its error.
+[[nodiscard]] inline std::optional<std::uint32_t> userOf(CommandContext& context, std::string_view key,
+                                                         ContainerClass containerClass) {
+    return validatedUser(context, context.request.unsignedInteger(key).value_or(0), containerClass);
+}
+
+[[nodiscard]] inline std::optional<std::string> stringIn(const plist::Dictionary& request, std::string_view key) {
+    const std::string* text = request.string(key);
+    return text ? std::optional(*text) : std::nullopt;
+}
+
+/// The one container that the request names by its UUID. Without a valid user the context has its error.
+[[nodiscard]] inline std::optional<ZORClientConnection::ContainerAddress> addressIn(CommandContext& context) {
+    const ContainerClass containerClass = classOf(context.request, ipc::keys::containerClass);
+    const auto user = userOf(context, ipc::keys::userId, containerClass);
+    if (!user)
+        return std::nullopt;
+    return ZORClientConnection::ContainerAddress{.userId = *user,
+                                                 .uuid = UUID::of(context.request, ipc::keys::uuid),
+                                                 .identifier = stringIn(context.request, ipc::keys::identifier),
+                                                 .containerClass = containerClass};
+}
+
+/// For operations that give nothing but success or an error.
+inline void storeError(CommandContext& context, const Result<void>& result) {
+    if (!result)
+        context.error = result.error().replyCode();
+}
 
 // ContainerCommands.cc
 void createOrLookupContainer(CommandContext& context);

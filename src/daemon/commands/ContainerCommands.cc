@@ -4,8 +4,7 @@
 // Changing the data-protection class of a container. It replies itself, when the change has ended.
 
 #include "daemon/commands/Commands.h"
-#include "daemon/commands/Request.h"
-#include "ipc/UUID.h"
+#include "ipc/Identifiers.h"
 
 namespace zor::commands {
 

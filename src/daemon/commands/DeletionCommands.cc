@@ -1,8 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Taking containers out of the store: a list of them, or the one of an identifier.
 #include "daemon/commands/Commands.h"
-#include "daemon/commands/Request.h"
-#include "ipc/UUID.h"
+#include "ipc/Identifiers.h"
 
 #include <algorithm>
 

@@ -1,8 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // How a process finds the containers it shares, and how an installer registers what an identifier is entitled to.
-#include "base/UserIdentity.h"
+#include "base/ContainerClass.h"
 #include "daemon/commands/Commands.h"
-#include "daemon/commands/Request.h"
 
 #include <algorithm>
 

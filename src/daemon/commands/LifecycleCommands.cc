@@ -1,8 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Replacing, repairing, wiping and measuring containers.
-#include "base/UserIdentity.h"
+#include "base/ContainerClass.h"
 #include "daemon/commands/Commands.h"
-#include "daemon/commands/Request.h"
 
 namespace zor::commands {
 

@@ -6,8 +6,7 @@
 #include "SealedDirectory.h"
 #include "Unpacker.h"
 #include "base/Try.h"
-#include "fs/DiskUsage.h"
-#include "fs/RecursiveCopy.h"
+#include "fs/Trees.h"
 #include "zorvane/Text.h"
 
 #include <algorithm>

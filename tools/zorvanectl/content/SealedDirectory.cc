@@ -1,10 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "SealedDirectory.h"
 
-#include "fs/BulkDirectoryRead.h"
 #include "fs/ItemStatus.h"
-#include "fs/RecursiveRemove.h"
-#include "os/Openat2.h"
+#include "fs/Trees.h"
+#include "os/FileDescriptor.h"
 #include "zorvane/Text.h"
 
 #include <array>

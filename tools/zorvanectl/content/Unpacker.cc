@@ -3,7 +3,7 @@
 
 #include "ItemRules.h"
 #include "base/Try.h"
-#include "os/Openat2.h"
+#include "os/FileDescriptor.h"
 #include "zorvane/Text.h"
 
 #include <algorithm>

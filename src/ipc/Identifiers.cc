@@ -1,0 +1,92 @@
+// SPDX-License-Identifier: Apache-2.0
+#include "ipc/Identifiers.h"
+
+#include "plist/Text.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <system_error>
+#include <unistd.h>
+
+namespace zor::ipc {
+
+bool isIdentifier(std::string_view text) {
+    if (text.size() > identifierBytesMax)
+        return false;
+    return plist::isAsciiWithoutNul(text.data(), text.size()) ||
+           (text.find('\0') == std::string_view::npos && plist::isUtf8(text));
+}
+
+} // namespace zor::ipc
+
+namespace zor {
+
+namespace {
+
+constexpr std::size_t textLength = 36;
+
+bool hyphenAt(std::size_t index) {
+    return index == 8 || index == 13 || index == 18 || index == 23;
+}
+
+int digitValue(char character) {
+    if (character >= '0' && character <= '9')
+        return character - '0';
+    if (character >= 'a' && character <= 'f')
+        return character - 'a' + 10;
+    if (character >= 'A' && character <= 'F')
+        return character - 'A' + 10;
+    return -1;
+}
+
+} // namespace
+
+UUID UUID::random() {
+    UUID uuid;
+    if (::getentropy(uuid.bytes_.data(), byteCount) != 0)
+        throw std::system_error(errno, std::generic_category(), "the kernel gave no random bytes");
+    uuid.bytes_[6] = static_cast<std::uint8_t>((uuid.bytes_[6] & 0x0f) | 0x40);
+    uuid.bytes_[8] = static_cast<std::uint8_t>((uuid.bytes_[8] & 0x3f) | 0x80);
+    return uuid;
+}
+
+std::optional<UUID> UUID::parse(std::string_view text) {
+    if (text.size() != textLength)
+        return std::nullopt;
+    UUID uuid;
+    std::size_t index = 0;
+    for (std::uint8_t& byte : uuid.bytes_) {
+        if (hyphenAt(index) && text[index++] != '-')
+            return std::nullopt;
+        const int high = digitValue(text[index++]);
+        const int low = digitValue(text[index++]);
+        if (high < 0 || low < 0)
+            return std::nullopt;
+        byte = static_cast<std::uint8_t>(high << 4 | low);
+    }
+    return uuid;
+}
+
+std::optional<UUID> UUID::of(const plist::Value* value) {
+    const plist::Data* data = value ? value->asData() : nullptr;
+    if (!data || data->size() != byteCount)
+        return std::nullopt;
+    UUID uuid;
+    std::copy(data->begin(), data->end(), uuid.bytes_.begin());
+    return uuid;
+}
+
+std::string UUID::string() const {
+    static constexpr char digits[] = "0123456789ABCDEF";
+    std::string text(textLength, '-');
+    std::size_t index = 0;
+    for (const std::uint8_t byte : bytes_) {
+        if (hyphenAt(index))
+            ++index;
+        text[index++] = digits[byte >> 4];
+        text[index++] = digits[byte & 15];
+    }
+    return text;
+}
+
+} // namespace zor

@@ -1,0 +1,60 @@
+// SPDX-License-Identifier: Apache-2.0
+// The two names of a container: its identifier, and its UUID.
+//
+// A UUID is data of exactly 16 bytes in a message, 36 characters in the names of directories and locks. It is a value
+// of one thread; the functions are pure, but for random.
+#pragma once
+
+#include "plist/Value.h"
+
+#include <array>
+#include <compare>
+#include <cstddef>
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace zor::ipc {
+
+// The rule for identifiers: of a container, of a program, of a group. Pure; any thread.
+
+/// An identifier is kept in memory and repeated in lists, for each container that has it. Those in use have some dozen
+/// bytes; names of files and domains stay below 256.
+inline constexpr std::size_t identifierBytesMax = 1024;
+
+/// At most identifierBytesMax bytes of UTF-8, and no NUL.
+[[nodiscard]] bool isIdentifier(std::string_view text);
+
+} // namespace zor::ipc
+
+namespace zor {
+
+class UUID {
+public:
+    static constexpr std::size_t byteCount = 16;
+    using Bytes = std::array<std::uint8_t, byteCount>;
+
+    UUID() = default;
+    explicit UUID(const Bytes& bytes) : bytes_(bytes) {}
+    /// A random (version 4) UUID from the kernel's generator. Throws std::system_error where the kernel gives none.
+    static UUID random();
+    /// The 8-4-4-4-12 form, digits in either case; nullopt for anything else.
+    static std::optional<UUID> parse(std::string_view text);
+    /// The UUID of a message. nullopt when `value` is nullptr or anything but 16 bytes of data.
+    static std::optional<UUID> of(const plist::Value* value);
+    static std::optional<UUID> of(const plist::Dictionary& dictionary, std::string_view key) {
+        return of(dictionary.find(key));
+    }
+
+    /// Upper-case hexadecimal digits with hyphens, 36 characters.
+    [[nodiscard]] std::string string() const;
+    [[nodiscard]] plist::Value value() const { return plist::Data(bytes_.begin(), bytes_.end()); }
+    [[nodiscard]] const Bytes& bytes() const { return bytes_; }
+    auto operator<=>(const UUID&) const = default;
+
+private:
+    Bytes bytes_{};
+};
+
+} // namespace zor
