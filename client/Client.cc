@@ -20,6 +20,9 @@ namespace plist = zor::plist;
 
 namespace {
 
+/// The daemon's code for an identifier that is not entitled to a system container.
+constexpr std::uint64_t codeNotEntitled = 55;
+
 plist::Dictionary request(ipc::Command command) {
     return {{std::string(keys::command), static_cast<std::uint64_t>(command)}};
 }
@@ -378,11 +381,40 @@ Result<std::uint64_t> Client::diskUsage(const Address& address) {
     return *bytes;
 }
 
-Result<Client::GroupPaths> Client::groupContainerPaths(std::uint32_t user, const std::string& identifier) {
-    plist::Dictionary message = request(ipc::Command::getGroupContainerPaths);
-    message.set(keys::userId, user);
+namespace {
+
+plist::Dictionary about(ipc::Command command, const std::string& identifier) {
+    plist::Dictionary message = request(command);
     setIdentifier(message, identifier);
-    return groupPathsIn(connection_->call(message));
+    return message;
+}
+
+plist::Dictionary groupsRequest(std::uint32_t user, const std::string& identifier) {
+    plist::Dictionary message = about(ipc::Command::getGroupContainerPaths, identifier);
+    message.set(keys::userId, user);
+    return message;
+}
+
+} // namespace
+
+Result<Client::GroupPaths> Client::groupContainerPaths(std::uint32_t user, const std::string& identifier) {
+    return groupPathsIn(connection_->call(groupsRequest(user, identifier)));
+}
+
+Result<Client::SharedContainers> Client::sharedContainers(std::uint32_t user, const std::string& identifier) {
+    const plist::Dictionary requests[] = {groupsRequest(user, identifier),
+                                          about(ipc::Command::getSystemGroupContainerPaths, identifier),
+                                          about(ipc::Command::getSystemContainerPath, identifier)};
+    auto replies = connection_->callTogether(requests);
+    auto applicationGroups = TRY(groupPathsIn(std::move(replies[0])));
+    auto systemGroups = TRY(groupPathsIn(std::move(replies[1])));
+    SharedContainers shared{.applicationGroups = std::move(applicationGroups), .systemGroups = std::move(systemGroups)};
+    auto path = pathIn(std::move(replies[2]));
+    if (path)
+        shared.systemContainer = std::move(*path);
+    else if (path.error().kind != Error::Kind::daemon || path.error().code != codeNotEntitled)
+        return std::unexpected(std::move(path.error()));
+    return shared;
 }
 
 Result<std::vector<std::string>> Client::groupContainerIdentifiers(std::uint32_t user, const std::string& identifier) {
@@ -403,15 +435,11 @@ Result<std::vector<std::string>> Client::groupContainerIdentifiers(std::uint32_t
 }
 
 Result<std::string> Client::systemContainerPath(const std::string& identifier) {
-    plist::Dictionary message = request(ipc::Command::getSystemContainerPath);
-    setIdentifier(message, identifier);
-    return pathIn(connection_->call(message));
+    return pathIn(connection_->call(about(ipc::Command::getSystemContainerPath, identifier)));
 }
 
 Result<Client::GroupPaths> Client::systemGroupContainerPaths(const std::string& identifier) {
-    plist::Dictionary message = request(ipc::Command::getSystemGroupContainerPaths);
-    setIdentifier(message, identifier);
-    return groupPathsIn(connection_->call(message));
+    return groupPathsIn(connection_->call(about(ipc::Command::getSystemGroupContainerPaths, identifier)));
 }
 
 Result<std::string> Client::systemGroupContainerPath(const std::string& groupIdentifier,

@@ -266,7 +266,21 @@ Result<plist::Dictionary> Client::Connection::call(const plist::Dictionary& requ
     const auto command = static_cast<ipc::Command>(request.unsignedInteger(ipc::keys::command).value_or(0));
     startTime(!options_.timeoutMilliseconds && mayTakeLong(command) ? timeoutOfEnvironment().value_or(0)
                                                                     : timeoutMilliseconds());
-    auto reply = exchange(request);
+    return judged(exchange(request));
+}
+
+std::vector<Result<plist::Dictionary>> Client::Connection::callTogether(std::span<const plist::Dictionary> requests) {
+    startTime(timeoutMilliseconds());
+    std::vector<Result<std::uint64_t>> sent;
+    for (const plist::Dictionary& request : requests)
+        sent.push_back(send(request));
+    std::vector<Result<plist::Dictionary>> replies;
+    for (const Result<std::uint64_t>& id : sent)
+        replies.push_back(judged(id ? replyTo(*id) : Result<plist::Dictionary>(std::unexpected(id.error()))));
+    return replies;
+}
+
+Result<plist::Dictionary> Client::Connection::judged(Result<plist::Dictionary> reply) const {
     if (!reply)
         return std::unexpected(explained(reply.error()));
     const auto code = reply->unsignedInteger(ipc::keys::replyError);

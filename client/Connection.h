@@ -10,7 +10,9 @@
 #include <cstdint>
 #include <map>
 #include <optional>
+#include <span>
 #include <string_view>
+#include <vector>
 
 namespace zorvane {
 
@@ -24,6 +26,9 @@ public:
     /// Sends a request and waits for its reply; a "ReplyError" other than success is the error. Replies to other
     /// requests that come first are kept.
     [[nodiscard]] Result<zor::plist::Dictionary> call(const zor::plist::Dictionary& request);
+    /// The same for several that do not wait for each other, within the time of one: one wait for all.
+    [[nodiscard]] std::vector<Result<zor::plist::Dictionary>>
+    callTogether(std::span<const zor::plist::Dictionary> requests);
     /// The next frame, whatever its id.
     struct Reply {
         std::uint64_t id = 0;
@@ -41,6 +46,7 @@ private:
     Connection(zor::platform::FileDescriptor socket, const ConnectOptions& options)
         : socket_(std::move(socket)), options_(options) {}
     Result<zor::plist::Dictionary> exchange(const zor::plist::Dictionary& request);
+    Result<zor::plist::Dictionary> judged(Result<zor::plist::Dictionary> reply) const;
     Result<std::uint64_t> send(const zor::plist::Dictionary& request);
     Result<zor::plist::Dictionary> replyTo(std::uint64_t id);
     Result<void> readAll(std::uint8_t* bytes, std::size_t count);

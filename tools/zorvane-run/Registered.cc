@@ -9,8 +9,6 @@ namespace zorvanerun {
 namespace {
 
 constexpr std::uint32_t answerMilliseconds = 30'000;
-/// The daemon's code for an identifier that is not entitled to a system container.
-constexpr std::uint64_t codeNotEntitled = 55;
 
 Failure failureOf(const zorvane::Error& error, const std::string& what) {
     using Kind = zorvane::Error::Kind;
@@ -59,20 +57,14 @@ Result<std::set<std::string>> choose(const zorvane::Client::GroupPaths& register
     return chosen;
 }
 
-Result<bool> chooseSystemContainer(zorvane::Client& client, const Options& options) {
+Result<bool> chooseSystemContainer(bool registered, const Options& options) {
     if (options.systemContainer && *options.systemContainer != options.identifier)
         return std::unexpected(Failure{
             .what = "the system container of " + *options.systemContainer + " cannot be given to " + options.identifier,
             .advice = "name the identifier itself: a system container has one owner. What several share is a "
                       "system group's"});
-    const auto path = client.systemContainerPath(options.identifier);
-    if (path)
-        return true;
-    if (path.error().kind != zorvane::Error::Kind::daemon || path.error().code != codeNotEntitled)
-        return std::unexpected(
-            failureOf(path.error(), "cannot look for the system container of " + options.identifier));
-    if (!options.systemContainer)
-        return false;
+    if (registered || !options.systemContainer)
+        return registered;
     return std::unexpected(Failure{.what = "no system container is registered for " + options.identifier,
                                    .advice = registerCommand(options, "--system-container")});
 }
@@ -80,20 +72,17 @@ Result<bool> chooseSystemContainer(zorvane::Client& client, const Options& optio
 } // namespace
 
 Result<WantedContainers> chooseContainers(const Options& options) {
-    const std::string what = "cannot look for the groups of " + options.identifier;
+    const std::string what = "cannot look for the groups and the system container of " + options.identifier;
     auto client = zorvane::Client::connect({.root = options.root, .timeoutMilliseconds = answerMilliseconds});
     if (!client)
         return std::unexpected(failureOf(client.error(), what));
-    const auto application = client->groupContainerPaths(options.user, options.identifier);
-    if (!application)
-        return std::unexpected(failureOf(application.error(), what));
-    const auto system = client->systemGroupContainerPaths(options.identifier);
-    if (!system)
-        return std::unexpected(failureOf(system.error(), what));
+    const auto shared = client->sharedContainers(options.user, options.identifier);
+    if (!shared)
+        return std::unexpected(failureOf(shared.error(), what));
     auto applicationGroups =
-        TRY(choose(*application, options.applicationGroups, "application", "--app-group", options));
-    auto systemGroups = TRY(choose(*system, options.systemGroups, "system", "--system-group", options));
-    const bool systemContainer = TRY(chooseSystemContainer(*client, options));
+        TRY(choose(shared->applicationGroups, options.applicationGroups, "application", "--app-group", options));
+    auto systemGroups = TRY(choose(shared->systemGroups, options.systemGroups, "system", "--system-group", options));
+    const bool systemContainer = TRY(chooseSystemContainer(shared->systemContainer.has_value(), options));
     return WantedContainers{.applicationGroups = std::move(applicationGroups),
                             .systemGroups = std::move(systemGroups),
                             .systemContainer = systemContainer};

@@ -169,6 +169,14 @@ public:
     /// Code 55: the identifier is not entitled to one.
     [[nodiscard]] Result<std::string> systemContainerPath(const std::string& identifier);
     [[nodiscard]] Result<GroupPaths> systemGroupContainerPaths(const std::string& identifier);
+    /// The containers that an identifier shares, or has of the system, in one exchange.
+    struct SharedContainers {
+        GroupPaths applicationGroups;
+        GroupPaths systemGroups;
+        /// Nothing where the identifier is not entitled to one.
+        std::optional<std::string> systemContainer;
+    };
+    [[nodiscard]] Result<SharedContainers> sharedContainers(std::uint32_t user, const std::string& identifier);
     /// Codes 55: the caller is not entitled to the group; 21: it has no container.
     [[nodiscard]] Result<std::string> systemGroupContainerPath(const std::string& groupIdentifier,
                                                                const std::string& identifier);
