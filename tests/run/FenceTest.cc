@@ -63,6 +63,8 @@ TEST(Fence, RefusesWhatLeadsOut) {
         {"setns", [] { return ::syscall(SYS_setns, -1, 0); }, EPERM},
         {"the kernel's log", [] { return ::syscall(SYS_syslog, 10, nullptr, 0); }, EPERM},
         {"io_uring", [] { return ::syscall(SYS_io_uring_setup, 1, nullptr); }, ENOSYS},
+        {"bpf", [] { return ::syscall(SYS_bpf, 0, nullptr, 0); }, EPERM},
+        {"userfaultfd", [] { return ::syscall(SYS_userfaultfd, 1); }, EPERM},
         {"TIOCSTI", [] { return ::syscall(SYS_ioctl, -1, TIOCSTI, "x"); }, EPERM},
         {"TIOCSTI, high half", [] { return ::syscall(SYS_ioctl, -1, TIOCSTI | 1UL << 40, "x"); }, EPERM},
         {"TIOCLINUX", [] { return ::syscall(SYS_ioctl, -1, TIOCLINUX, "x"); }, EPERM},

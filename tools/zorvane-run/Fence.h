@@ -5,7 +5,8 @@
 // Those are: keys (the caller's, and those that all processes of one user share); namespaces of the program's own, in
 // which it would have every capability; the kernel's log; typing into the caller's terminal; and, without the host's
 // network, sockets of families that no network namespace holds apart. io_uring is refused with them, for its calls pass
-// by the filter.
+// by the filter; and what only root has a use for, or large parts of the kernel behind it that programs can do without:
+// mounts, modules, the clock, BPF, performance counters, userfaultfd, fanotify.
 #pragma once
 
 #include "Options.h"
