@@ -26,8 +26,10 @@ constexpr std::string_view keySecurityLabel = "SecurityLabel";
 constexpr std::string_view keyEntitlements = "Entitlements";
 constexpr std::string_view keyKernelAgent = "KernelAgent";
 constexpr std::string_view keyOnlyOwnIdentifier = "OnlyOwnIdentifier";
-constexpr std::array keysKnown = {keyIdentifier,    keyExecutable,   keyUserIds,     keyUnit,
-                                  keySecurityLabel, keyEntitlements, keyKernelAgent, keyOnlyOwnIdentifier};
+constexpr std::string_view keyPassedSockets = "PassedSockets";
+constexpr std::array keysKnown = {keyIdentifier,  keyExecutable,        keyUserIds,
+                                  keyUnit,        keySecurityLabel,     keyEntitlements,
+                                  keyKernelAgent, keyOnlyOwnIdentifier, keyPassedSockets};
 
 using Problem = std::optional<std::string>;
 
@@ -112,6 +114,8 @@ Problem readEntry(const plist::Dictionary& file, RegistryEntry& entry) {
         return problem;
     if (Problem problem = readUserIds(file, entry))
         return problem;
+    if (Problem problem = readFlag(file, keyPassedSockets, entry.passedSockets))
+        return problem;
     return readGrant(file, entry);
 }
 
@@ -134,9 +138,9 @@ bool RegistryEntry::admitsUser(std::uint32_t reportedUserId) const {
 
 bool RegistryEntry::operator==(const RegistryEntry& other) const {
     return executable == other.executable && userIds == other.userIds && unit == other.unit &&
-           securityLabel == other.securityLabel && grant->identifier == other.grant->identifier &&
-           grant->entitlements == other.grant->entitlements && grant->kernelAgent == other.grant->kernelAgent &&
-           grant->onlyOwnIdentifier == other.grant->onlyOwnIdentifier;
+           securityLabel == other.securityLabel && passedSockets == other.passedSockets &&
+           grant->identifier == other.grant->identifier && grant->entitlements == other.grant->entitlements &&
+           grant->kernelAgent == other.grant->kernelAgent && grant->onlyOwnIdentifier == other.grant->onlyOwnIdentifier;
 }
 
 std::expected<RegistryEntry, std::string> parseIdentityFile(std::span<const std::uint8_t> bytes) {

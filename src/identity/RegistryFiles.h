@@ -30,6 +30,8 @@ struct RegistryEntry {
     std::optional<std::vector<std::uint32_t>> userIds;
     std::optional<std::string> unit;
     std::optional<std::string> securityLabel;
+    /// The identifier's programs may be given sockets that a service manager opened. The launcher's to ask.
+    bool passedSockets = false;
     /// Never nullptr.
     std::shared_ptr<const IdentityGrant> grant;
 

@@ -364,6 +364,7 @@ TEST(IdentityFile, RefusesWhatItDoesNotUnderstand) {
         {"Entitlements", {"<array/>"}},
         {"KernelAgent", {"<integer>1</integer>"}},
         {"OnlyOwnIdentifier", {"<string>true</string>"}},
+        {"PassedSockets", {"<string>true</string>"}},
         // A fence with a typing mistake must not be a fence that is not there.
         {"UserIds", {"<array><integer>501</integer></array>"}},
         {"Executable ", {"<string>/b</string>"}}};

@@ -17,18 +17,31 @@ using zor::platform::FileDescriptor;
 
 namespace {
 
-/// Whether it can reach one peer and no other. One of the network can be connected anew, and so can datagrams.
+/// -1 for what has no such option.
+int optionOf(int socket, int name) {
+    int value = -1;
+    socklen_t length = sizeof value;
+    return ::getsockopt(socket, SOL_SOCKET, name, &value, &length) == 0 ? value : -1;
+}
+
+/// Whether it keeps the peer that it has. One of the network can be connected anew, and so can datagrams.
+bool isUnixStream(int socket) {
+    const int type = optionOf(socket, SO_TYPE);
+    return optionOf(socket, SO_DOMAIN) == AF_UNIX && (type == SOCK_STREAM || type == SOCK_SEQPACKET);
+}
+
 bool isBoundToOnePeer(int socket) {
-    const auto option = [&](int name) {
-        int value = -1;
-        socklen_t length = sizeof value;
-        return ::getsockopt(socket, SOL_SOCKET, name, &value, &length) == 0 ? value : -1;
-    };
     sockaddr_storage peer{};
     socklen_t length = sizeof peer;
-    const int type = option(SO_TYPE);
-    return option(SO_DOMAIN) == AF_UNIX && (type == SOCK_STREAM || type == SOCK_SEQPACKET) &&
-           ::getpeername(socket, reinterpret_cast<sockaddr*>(&peer), &length) == 0;
+    return isUnixStream(socket) && ::getpeername(socket, reinterpret_cast<sockaddr*>(&peer), &length) == 0;
+}
+
+/// Whether a program without any power could make such a one in the host's network.
+bool isUsualSocket(int socket) {
+    const int domain = optionOf(socket, SO_DOMAIN);
+    const int type = optionOf(socket, SO_TYPE);
+    return (domain == AF_UNIX || domain == AF_INET || domain == AF_INET6) &&
+           (type == SOCK_STREAM || type == SOCK_DGRAM || type == SOCK_SEQPACKET);
 }
 
 /// nullptr when it leads nowhere.
@@ -63,6 +76,20 @@ std::string whyStandardDescriptorRefused(Network network) {
         if (const char* why = whyRefused(fd, network))
             return std::string("standard ") + names[fd] + " " + why;
     return {};
+}
+
+const char* whyPassedRefused(int fd, Network network) {
+    struct stat status{};
+    const int flags = ::fcntl(fd, F_GETFL);
+    if (flags < 0 || ::fstat(fd, &status) != 0)
+        return "is not open";
+    if ((flags & O_PATH) != 0 || !(S_ISFIFO(status.st_mode) || S_ISSOCK(status.st_mode)))
+        return "is neither a socket nor a pipe with a name";
+    if (S_ISFIFO(status.st_mode) || isBoundToOnePeer(fd) || (isUnixStream(fd) && optionOf(fd, SO_ACCEPTCONN) == 1))
+        return nullptr;
+    if (!isUsualSocket(fd))
+        return "is a socket of a kind that only root can make, or that is not connected";
+    return network == Network::host ? nullptr : "is a socket that reaches the host's network";
 }
 
 bool closeOnExecFrom(int first) {

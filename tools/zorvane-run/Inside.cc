@@ -10,6 +10,7 @@
 #include <csignal>
 #include <cstdint>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
 #include <grp.h>
@@ -24,10 +25,12 @@ namespace zorvanerun {
 
 namespace {
 
+/// The kernel's set of signals.
+constexpr std::size_t signalSetBytes = 8;
 /// Only its owner may change what a program makes.
 constexpr mode_t usualUmask = 022;
 
-enum Argument : int { optionAt = 1, channelAt, userAt, networkAt, directoryAt, programAt };
+enum Argument : int { optionAt = 1, channelAt, userAt, networkAt, passedAt, programAt };
 
 int say(const std::string& what, int exitCode) {
     std::fprintf(stderr, "zorvane-run: %s\n", printable(what).c_str());
@@ -49,10 +52,10 @@ bool dropCapabilities() {
 }
 
 bool dropBoundingSet() {
-    for (unsigned long capability = 0; ::prctl(PR_CAPBSET_READ, capability, 0, 0, 0) >= 0; ++capability)
-        if (::prctl(PR_CAPBSET_DROP, capability, 0, 0, 0) != 0)
-            return false;
-    return true;
+    unsigned long capability = 0;
+    while (::prctl(PR_CAPBSET_DROP, capability, 0, 0, 0) == 0)
+        ++capability;
+    return errno == EINVAL && capability > 0; // the first that the kernel does not know
 }
 
 bool hasNothingLeft(uid_t user) {
@@ -83,8 +86,11 @@ bool become(uid_t user) {
 
 /// A caller that ignores a signal, or has it blocked, means itself.
 void takeSignals() {
+    // Also of those that the C library keeps to itself: it ignores them in what it starts. All zero is the default, in
+    // the kernel's form of an action, which is not larger.
+    const struct sigaction usual{};
     for (int number = 1; number <= SIGRTMAX; ++number)
-        (void)::signal(number, SIG_DFL); // two have no other effect than their own, and say so
+        (void)::syscall(SYS_rt_sigaction, number, &usual, nullptr, signalSetBytes); // two have none, and say so
     sigset_t none;
     ::sigemptyset(&none);
     ::sigprocmask(SIG_SETMASK, &none, nullptr);
@@ -95,25 +101,30 @@ void takeSignals() {
 int runInside(int argumentCount, char** arguments) {
     int channel = -1;
     std::uint32_t user = 0;
+    int passed = 0;
     std::optional<Network> network;
     if (argumentCount <= Argument::programAt || !parse(arguments[Argument::channelAt], channel) || channel < 0 ||
         !parse(arguments[Argument::userAt], user) || user == 0 ||
-        !(network = networkNamed(arguments[Argument::networkAt])))
+        !(network = networkNamed(arguments[Argument::networkAt])) || !parse(arguments[Argument::passedAt], passed) ||
+        passed < 0)
         return say("the option is for the use of zorvane-run itself", exitFailure);
     if (!leaveKeys())
         return say(withReason("cannot leave the caller's keys", zor::Errno::last()), exitFailure);
     if (!become(user))
         return say(withReason("cannot become user " + std::to_string(user), zor::Errno::last()), exitFailure);
     // As the user: a container may be closed to everybody else.
-    const char* const directory = arguments[Argument::directoryAt];
-    if (::chdir(directory) != 0)
-        return say(withReason("cannot go to " + std::string(directory), zor::Errno::last()), exitFailure);
+    const char* const directory = std::getenv("HOME");
+    if (!directory || ::chdir(directory) != 0 || ::setenv("PWD", directory, 1) != 0)
+        return say(withReason("cannot go to " + std::string(directory ? directory : "HOME"), zor::Errno::last()),
+                   exitFailure);
     ::umask(usualUmask);
     takeSignals();
     const zor::platform::FileDescriptor self(static_cast<int>(::syscall(SYS_pidfd_open, ::getpid(), 0)));
     if (!self.valid() || !sendDescriptor(channel, self.get()))
         return say(withReason("cannot report", zor::Errno::last()), exitFailure);
-    if (!closeOnExecFrom(STDERR_FILENO + 1))
+    if (passed > 0 && ::setenv("LISTEN_PID", std::to_string(::getpid()).c_str(), 1) != 0)
+        return say(withReason("cannot tell of the passed sockets", zor::Errno::last()), exitFailure);
+    if (!closeOnExecFrom(firstPassed + passed))
         return say(withReason("cannot close descriptors", zor::Errno::last()), exitFailure);
     if (!fence(*network))
         return say(withReason("the kernel does not take the rules for system calls", zor::Errno::last()), exitFailure);

@@ -3,17 +3,17 @@
 // program that was asked for.
 //
 // It is executed through a descriptor, since it lies nowhere in the sandbox. Descriptors for its own use (the
-// sandbox's lead outside) are closed by the execution. The caller's keys, umask and ignored signals end
-// here; its priority, limits and the like go on to the program: a service manager sets them for it. Whatever of this
-// does not work out ends it: the program never runs with more than its user may.
+// sandbox's lead outside) are closed by the execution; sockets that were passed stay. The caller's keys, umask and
+// ignored signals end here; its priority, limits and the like go on to the program: a service manager sets them for it.
+// Whatever of this does not work out ends it: the program never runs with more than its user may.
 #pragma once
 
 #include <string>
 
 namespace zorvanerun {
 
-/// The first argument of the inner execution. The others: descriptor of the channel, user, network, directory to
-/// start in, program, its arguments.
+/// The first argument of the inner execution. The others: descriptor of the channel, user, network, number of
+/// passed sockets, program, its arguments. The program starts in HOME.
 inline constexpr const char* insideOption = "--inside";
 
 /// Executes the program, or returns the exit code of the failure. On the channel goes one message with a pidfd of the

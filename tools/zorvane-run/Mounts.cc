@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Mounts.h"
 
+#include "Staging.h"
 #include "base/Try.h"
 #include "fs/MountFences.h"
 #include "os/FileDescriptor.h"
@@ -11,6 +12,7 @@
 #include <climits>
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <sys/statvfs.h>
 
 namespace zorvanerun {
 
@@ -22,7 +24,7 @@ namespace {
 /// Directories of the system that are shown if they exist. Most are links into /usr if that holds everything.
 constexpr const char* systemDirectories[] = {"/usr", "/bin", "/sbin", "/lib", "/lib32", "/lib64", "/libx32", "/etc"};
 /// Places that the sandbox fills itself.
-constexpr const char* ownDirectories[] = {"/proc", "/dev", "/tmp"};
+constexpr const char* ownDirectories[] = {"/proc", "/dev", memoryPlace, "/tmp"};
 
 // The system's containers are the daemon's, or the user's that owns them by name: an older system made them so.
 constexpr uid_t rootUser = 0;
@@ -75,6 +77,25 @@ std::string cannotOpen(const std::string& place, zor::Errno error) {
     return withReason(place + " cannot be opened", error);
 }
 
+/// The absolute path that a link in /etc means.
+std::string fromEtc(std::string_view target) {
+    std::string path = target.starts_with('/') ? "" : "/etc";
+    while (!target.empty()) {
+        const std::string_view name = target.substr(0, target.find('/'));
+        target.remove_prefix(std::min(name.size() + 1, target.size()));
+        if (name == "..")
+            path.erase(std::min(path.rfind('/'), path.size()));
+        else if (!name.empty() && name != ".")
+            path.append("/").append(name);
+    }
+    return path;
+}
+
+/// Whether the sandbox has things of its own at that place, which would hide what is mounted there.
+bool isHidden(const std::string& path) {
+    return isAtOrBelow(path, "/proc") || (isAtOrBelow(path, "/dev") && !isAtOrBelow(path, memoryPlace));
+}
+
 class Collector {
 public:
     Collector(const Root& root, const Options& options, const std::string& home, std::vector<Mount>& mounts)
@@ -89,6 +110,9 @@ public:
             if (isAtOrBelow(path, directory))
                 return failed(what + " " + path + " lies in " + directory + ", which every program sees",
                               "give the daemon a root elsewhere");
+        if (isHidden(path))
+            return failed(what + " " + path + " lies where the sandbox has things of its own",
+                          "give the daemon a root elsewhere");
         const std::string advice =
             "somebody has changed the directory: look who can write to the one that holds it, and put the container "
             "back where it was";
@@ -107,6 +131,12 @@ public:
             return failed(what + " " + path + " belongs to user " + std::to_string(status.st_uid) + ", not to " +
                               (users ? "user " + std::to_string(options_.user) : "the system"),
                           advice);
+        struct statvfs space{};
+        if (::fstatvfs(directory->get(), &space) == 0 && (space.f_flag & ST_RDONLY) != 0)
+            return failed(
+                what + " " + path + " is read-only here",
+                "of the unit, take away ProtectSystem=strict and ReadOnlyPaths=, or name the homes and the "
+                "system's containers in ReadWritePaths=; if no unit does it, see what befell the file system");
         mounts_.push_back({.kind = kind,
                            .identifier = identifier,
                            .path = path,
@@ -125,7 +155,7 @@ public:
     Result<void> readOnly(const Root& device, const std::string& path, const std::vector<std::string>& containers) {
         const std::string advice = "name a directory by its real, absolute path; not one that holds containers or what "
                                    "the sandbox has anyway";
-        bool clashes = !isPlainPath(path);
+        bool clashes = !isPlainPath(path) || isHidden(path);
         for (const std::string& container : containers)
             clashes = clashes || isAtOrBelow(container, path) || isAtOrBelow(path, container);
         for (const char* directory : ownDirectories)
@@ -166,6 +196,31 @@ public:
             mounts_.push_back(std::move(mount));
         }
         return {};
+    }
+
+    /// With the host's network: the file that /etc/resolv.conf leads to, where the sandbox has nothing of that place.
+    /// The link is root's; on the way that it names no other is followed, for there others may write. Without such a
+    /// file the link dangles, as it does outside.
+    void resolver(const Root& device) {
+        char target[PATH_MAX];
+        const ssize_t length = ::readlinkat(device.descriptor.get(), "etc/resolv.conf", target, sizeof target);
+        if (options_.network != Network::host || length <= 0)
+            return;
+        const std::string path = fromEtc({target, static_cast<std::size_t>(length)});
+        constexpr std::string_view oldRun = "/var/run/"; // everywhere a link to /run
+        const std::string real = path.starts_with(oldRun) ? "/run/" + path.substr(oldRun.size()) : path;
+        if (!isPlainPath(real) || isHidden(path) ||
+            std::ranges::any_of(systemDirectories, [&](const char* shown) { return isAtOrBelow(path, shown); }))
+            return;
+        auto file = openBeneath(device.descriptor.get(), real.c_str() + 1, O_PATH | O_NOFOLLOW);
+        struct stat status{};
+        if (file && ::fstat(file->get(), &status) == 0 && S_ISREG(status.st_mode))
+            mounts_.push_back({.kind = Mount::Kind::system,
+                               .identifier = {},
+                               .path = path,
+                               .descriptor = std::move(*file),
+                               .linkTarget = {},
+                               .isFile = true});
     }
 
 private:
@@ -217,6 +272,8 @@ Result<std::vector<Mount>> openMounts(const Root& root, const Options& options, 
     for (const std::string& path : options.readOnly)
         if (done)
             done = collector.readOnly(device, path, containers);
+    if (done)
+        collector.resolver(device);
     if (done)
         done = collector.container(Mount::Kind::data, options.identifier, told.data);
     if (done)

@@ -24,6 +24,8 @@ struct Mount {
     zor::platform::FileDescriptor descriptor; // O_PATH
     /// Not empty: a symbolic link of the system's own, made anew; there is no descriptor then.
     std::string linkTarget;
+    /// A file, in a directory that the sandbox makes for it.
+    bool isFile = false;
 
     [[nodiscard]] bool isContainer() const { return kind != Kind::readOnly && kind != Kind::system; }
 };

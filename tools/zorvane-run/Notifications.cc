@@ -91,8 +91,7 @@ std::vector<std::string> Notifications::environment() const {
 }
 
 std::vector<std::string> Notifications::arguments() const {
-    return areWanted() ? std::vector<std::string>{"--bind", stagedSocketPath(), placeInside}
-                       : std::vector<std::string>();
+    return areWanted() ? std::vector<std::string>{"--bind", stagedSocket, placeInside} : std::vector<std::string>();
 }
 
 const char* Notifications::appear() const {
@@ -100,7 +99,7 @@ const char* Notifications::appear() const {
         return nullptr;
     sockaddr_un address{};
     socklen_t length = 0;
-    const std::string path = stagedSocketPath();
+    const std::string path = stagedSocket;
     if (const zor::Errno error = addressOf(path, address, length)) {
         errno = error.number();
         return "bind";

@@ -5,7 +5,7 @@
 // the program finds one of this object's. The lines of each message that speak of the program's own state are sent on,
 // and no descriptor: no other process can be named, nothing be left with the manager. A message that the manager does
 // not take yet is kept, and no other is read meanwhile: a program that tells too much waits, the launcher does not. One
-// thread; the process that makes the sandbox has a copy.
+// thread.
 #pragma once
 
 #include "Failure.h"
@@ -29,7 +29,7 @@ public:
     [[nodiscard]] std::vector<std::string> environment() const;
     /// For the maker of the sandbox: what shows the socket to the program.
     [[nodiscard]] std::vector<std::string> arguments() const;
-    /// In the process that makes the sandbox, when all is staged. nullptr, or the name of the call that failed.
+    /// When all is staged. nullptr, or the name of the call that failed.
     [[nodiscard]] const char* appear() const;
 
     /// The event that pass() waits for; to be polled.

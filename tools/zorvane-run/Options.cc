@@ -4,6 +4,7 @@
 #include "Failure.h"
 #include "identity/Users.h"
 
+#include <algorithm>
 #include <getopt.h>
 
 namespace zorvanerun {
@@ -22,6 +23,7 @@ a read-only system, and nothing else of any user. What is missing is made.
   --system-group G       this system group, and no other; may repeat
   --system-container ID  fail unless ID, which is the identifier, owns a system container
   --read-only DIR        show DIR too, read-only: the program's own files; may repeat
+  --setenv NAME=VALUE    put this into the program's environment; may repeat
   --root DIR             system root of the daemon (default /)
   --network none|host    no network but the program's own loopback (default), or the host's
   --bubblewrap FILE      the program that makes the sandbox (default /usr/bin/bwrap)
@@ -38,13 +40,14 @@ While the data protection of its files is being changed, a program is not starte
 The program finds HOME (its data container), TMPDIR (in it), ZORVANE_IDENTIFIER,
 ZORVANE_SYSTEM_CONTAINER (a path, where there is one), and ZORVANE_APP_GROUPS and
 ZORVANE_SYSTEM_GROUPS (a line for each: group, tab, path). Of the caller's environment
-it gets LANG, LANGUAGE, LC_*, TERM and TZ; use env(1) for more. What it tells the
-caller's NOTIFY_SOCKET of its own state is passed on.
+it gets LANG, LANGUAGE, LC_*, TERM and TZ; --setenv gives more. What it tells the
+caller's NOTIFY_SOCKET of its own state is passed on; the caller's sockets (LISTEN_FDS)
+are passed to it where a registry entry of the identifier allows that.
 
 Examples:
   zorvane-run --identifier org.example.notes --user 501 -- /usr/bin/notes --new
   zorvane-run --identifier org.example.notes --user 501 --read-only /opt/notes \
-      -- env DEBUG=1 /opt/notes/bin/notes
+      --setenv DEBUG=1 -- /opt/notes/bin/notes
   zorvane-run --identifier org.example.notes --user 501 --dry-run -- notes
 
 Exit codes: that of the program, 128+n when signal n ended it; 125 when zorvane-run
@@ -75,6 +78,21 @@ std::optional<OptionsEnd> findUser(Options& options) {
     return std::nullopt;
 }
 
+/// nullptr for what a program may find. The loader's names count in this program's own part of the sandbox, too, which
+/// has powers yet; the others are said by this program.
+const char* whyNotSet(std::string_view variable) {
+    constexpr std::string_view taken[] = {
+        "LD_",     "LISTEN_", "WATCHDOG_", "ZORVANE_",       "GLIBC_TUNABLES=", "HOME=",
+        "TMPDIR=", "PATH=",   "PWD=",      "NOTIFY_SOCKET=", "GCONV_PATH="};
+    const std::string_view name = variable.substr(0, variable.find('='));
+    if (name.size() == variable.size() || name.empty() ||
+        name.find_first_not_of("ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789_") != name.npos)
+        return "it is not of the form NAME=VALUE";
+    if (std::ranges::any_of(taken, [&](std::string_view begin) { return variable.starts_with(begin); }))
+        return "the loader or zorvane-run itself gives that name a meaning; env(1) in front of the program can set it";
+    return nullptr;
+}
+
 enum Option : int {
     root = 1,
     identifier,
@@ -83,6 +101,7 @@ enum Option : int {
     systemGroup,
     systemContainer,
     readOnly,
+    setEnvironment,
     network,
     bubblewrap,
     dryRun,
@@ -98,6 +117,7 @@ constexpr option known[] = {
     {"system-group", required_argument, nullptr, Option::systemGroup},
     {"system-container", required_argument, nullptr, Option::systemContainer},
     {"read-only", required_argument, nullptr, Option::readOnly},
+    {"setenv", required_argument, nullptr, Option::setEnvironment},
     {"network", required_argument, nullptr, Option::network},
     {"bubblewrap", required_argument, nullptr, Option::bubblewrap},
     {"dry-run", no_argument, nullptr, Option::dryRun},
@@ -131,6 +151,11 @@ std::optional<OptionsEnd> take(int option, const char* value, const char* argume
         return std::nullopt;
     case Option::readOnly:
         options.readOnly.emplace_back(value);
+        return std::nullopt;
+    case Option::setEnvironment:
+        if (const char* const why = whyNotSet(value))
+            return usage("'" + std::string(value) + "' cannot be set: " + why);
+        options.environment.emplace_back(value);
         return std::nullopt;
     case Option::network:
         if (const auto network = networkNamed(value)) {

@@ -31,6 +31,8 @@ struct Options {
     std::optional<std::string> systemContainer;
     /// Directories that the program may read besides the system's own: its code, for instance.
     std::vector<std::string> readOnly;
+    /// "NAME=VALUE" each, for the program; none of a name that means something on the way there.
+    std::vector<std::string> environment;
     Network network = Network::none;
     std::string bubblewrap = "/usr/bin/bwrap";
     bool dryRun = false;

@@ -5,7 +5,6 @@
 #include "Staging.h"
 
 #include <algorithm>
-#include <set>
 #include <string_view>
 #include <unistd.h>
 
@@ -17,13 +16,6 @@ constexpr const char* keysFile = "/proc/keys";
 
 void append(std::vector<std::string>& to, std::initializer_list<std::string> more) {
     to.insert(to.end(), more);
-}
-
-/// The directories above a mount, made so that everybody may pass: the maker's own way is to close them.
-void makeParents(std::vector<std::string>& arguments, const std::string& path, std::set<std::string>& made) {
-    for (std::size_t end = path.find('/', 1); end != path.npos; end = path.find('/', end + 1))
-        if (made.insert(path.substr(0, end)).second)
-            append(arguments, {"--perms", "0755", "--dir", path.substr(0, end)});
 }
 
 std::string linesOf(const std::map<std::string, std::string>& groups) {
@@ -42,38 +34,43 @@ bool isPassedOn(std::string_view variable) {
 
 } // namespace
 
-std::vector<std::string> sandboxArguments(const Options& options, const std::vector<Mount>& mounts,
-                                          const ToldContainers& told, const Notifications& notifications,
-                                          InsideHandles handles) {
-    std::vector<std::string> arguments = {
-        options.bubblewrap, "--unshare-pid", "--unshare-ipc", "--unshare-uts", "--new-session", "--cap-drop", "ALL"};
+std::vector<std::string> makerCommand(const Options& options, const PassedSockets& passed, InsideHandles handles) {
+    std::vector<std::string> command = {options.bubblewrap,
+                                        "--args",
+                                        std::to_string(handles.arguments),
+                                        "--",
+                                        "/proc/self/fd/" + std::to_string(handles.program),
+                                        insideOption,
+                                        std::to_string(handles.channel),
+                                        std::to_string(options.user),
+                                        networkName(options.network),
+                                        std::to_string(passed.count)};
+    command.insert(command.end(), options.command.begin(), options.command.end());
+    return command;
+}
+
+std::vector<std::string> sandboxArguments(const Options& options, const ToldContainers& told,
+                                          const Notifications& notifications, const PassedSockets& passed) {
+    std::vector<std::string> arguments = {"--unshare-pid", "--unshare-ipc", "--unshare-uts",
+                                          "--new-session", "--cap-drop",    "ALL"};
     if (options.network == Network::none)
         arguments.emplace_back("--unshare-net");
     for (const char* capability : {"CAP_SETUID", "CAP_SETGID", "CAP_SETPCAP"})
         append(arguments, {"--cap-add", capability});
-    append(arguments, {"--proc", "/proc", "--dev", "/dev"});
+    append(arguments, {"--bind", stagedRoot, "/", "--proc", "/proc", "--dev", "/dev"});
     // The keys of all processes of the user, by name.
     if (::access(keysFile, F_OK) == 0)
         append(arguments, {"--ro-bind", "/dev/null", keysFile});
+    append(arguments, {"--bind", stagedMemory, memoryPlace});
     const std::vector<std::string> socket = notifications.arguments();
     arguments.insert(arguments.end(), socket.begin(), socket.end());
-    std::set<std::string> made = {"/proc", "/dev"};
-    for (std::size_t i = 0; i < memoryPlaces.size(); ++i) {
-        append(arguments, {"--bind", stagedMemoryPath(i), memoryPlaces[i]});
-        made.insert(memoryPlaces[i]);
+    std::vector<std::string> environment = sandboxEnvironment(options, told);
+    for (const auto& more : {notifications.environment(), passed.environment()})
+        environment.insert(environment.end(), more.begin(), more.end());
+    for (const std::string& variable : environment) {
+        const std::size_t end = variable.find('=');
+        append(arguments, {"--setenv", variable.substr(0, end), variable.substr(end + 1)});
     }
-    for (std::size_t i = 0; i < mounts.size(); ++i) {
-        const Mount& mount = mounts[i];
-        makeParents(arguments, mount.path, made);
-        if (mount.linkTarget.empty())
-            append(arguments, {mount.isContainer() ? "--bind" : "--ro-bind", stagedPath(i), mount.path});
-        else
-            append(arguments, {"--symlink", mount.linkTarget, mount.path});
-    }
-    append(arguments,
-           {"--", "/proc/self/fd/" + std::to_string(handles.program), insideOption, std::to_string(handles.channel),
-            std::to_string(options.user), networkName(options.network), told.data});
-    arguments.insert(arguments.end(), options.command.begin(), options.command.end());
     return arguments;
 }
 
@@ -91,6 +88,8 @@ std::vector<std::string> sandboxEnvironment(const Options& options, const ToldCo
     for (char** variable = ::environ; variable && *variable; ++variable)
         if (isPassedOn(*variable))
             environment.emplace_back(*variable);
+    // The last of a name counts.
+    environment.insert(environment.end(), options.environment.begin(), options.environment.end());
     return environment;
 }
 

@@ -1,10 +1,16 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Staging.h"
 
+#include "os/FileDescriptor.h"
+
+#include <cerrno>
+#include <cstring>
 #include <fcntl.h>
 #include <sched.h>
+#include <set>
 #include <sys/mount.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 namespace zorvanerun {
 
@@ -15,57 +21,112 @@ namespace {
 /// Made for things that are mounted for a while; the sandbox shows nothing of it.
 constexpr const char* stagingDirectory = "/mnt";
 
-/// For each place; it counts as the program's memory. An inode, which `size` does not count, takes a kilobyte of the
-/// kernel's: one for each page is more than files of any content need.
+/// For /tmp and /dev/shm each; it counts as the program's memory. An inode, which `size` does not count, takes a
+/// kilobyte of the kernel's: one for each page is more than files of any content need.
 constexpr const char* memoryOptions = "mode=1777,size=64m,nr_inodes=16384";
+constexpr unsigned long memoryFlags = MS_NOSUID | MS_NODEV;
+constexpr mode_t openMode = 0755;
+
+/// The directories that are there whatever is mounted. Programs look into the last two, and find nothing of the host's.
+constexpr const char* emptyDirectories[] = {"proc", "dev", "tmp", "run", "var"};
+
+/// A copy of the tree with everything mounted in it, and with the flags that it has in the sandbox; -1, errno set.
+FileDescriptor copyOf(const Mount& mount) {
+    FileDescriptor tree(
+        ::open_tree(mount.descriptor.get(), "", AT_EMPTY_PATH | AT_RECURSIVE | OPEN_TREE_CLONE | OPEN_TREE_CLOEXEC));
+    if (!tree.valid())
+        return tree;
+    mount_attr attributes{};
+    attributes.attr_set = MOUNT_ATTR_NOSUID | MOUNT_ATTR_NODEV;
+    if (!mount.isContainer())
+        attributes.attr_set |= MOUNT_ATTR_RDONLY;
+    if (::mount_setattr(tree.get(), "", AT_EMPTY_PATH | AT_RECURSIVE, &attributes, sizeof attributes) != 0)
+        return FileDescriptor();
+    return tree;
+}
+
+/// A place that is filled: names below it are resolved without following a link, for a directory that was mounted there
+/// may be in others' hands.
+class Tree {
+public:
+    explicit Tree(int root) : root_(root) {}
+
+    /// The place for a mount at a path that begins with a slash, made with the directories above it: everybody may
+    /// pass.
+    [[nodiscard]] FileDescriptor place(const std::string& path, bool isFile) {
+        for (std::size_t end = path.find('/', 1);; end = path.find('/', end + 1)) {
+            const std::string part = path.substr(1, end == path.npos ? end : end - 1);
+            if (made_.insert(part).second && !make(part.c_str(), isFile && end == path.npos) && errno != EEXIST)
+                return FileDescriptor();
+            if (end == path.npos)
+                break;
+        }
+        auto opened = zor::platform::openBeneath(root_, path.c_str() + 1, O_PATH | O_NOFOLLOW);
+        if (opened)
+            return std::move(*opened);
+        errno = opened.error().number();
+        return FileDescriptor();
+    }
+
+private:
+    [[nodiscard]] bool make(const char* path, bool isFile) const {
+        return (isFile ? ::mknodat(root_, path, S_IFREG | 0444, 0) : ::mkdirat(root_, path, openMode)) == 0;
+    }
+
+    const int root_;
+    std::set<std::string> made_;
+};
 
 } // namespace
 
-std::string stagedPath(std::size_t index) {
-    return std::string(stagingDirectory) + "/" + std::to_string(index);
-}
-
-std::string stagedMemoryPath(std::size_t index) {
-    return std::string(stagingDirectory) + "/memory" + std::to_string(index);
-}
-
-std::string stagedSocketPath() {
-    return std::string(stagingDirectory) + "/socket";
-}
-
-const char* stage(const std::vector<Mount>& mounts) {
-    // Copies can be made only of what is mounted in the own namespace: first they, then the new one.
-    std::vector<FileDescriptor> trees;
-    for (const Mount& mount : mounts) {
-        FileDescriptor& tree = trees.emplace_back();
-        if (!mount.descriptor.valid())
-            continue;
-        tree.reset(::open_tree(mount.descriptor.get(), "",
-                               AT_EMPTY_PATH | AT_RECURSIVE | OPEN_TREE_CLONE | OPEN_TREE_CLOEXEC));
-        if (!tree.valid())
-            return "open_tree";
-    }
+const char* leaveMountNamespace() {
     if (::unshare(CLONE_NEWNS) != 0)
         return "unshare";
     // Mounts that are made here stay here.
-    if (::mount(nullptr, "/", nullptr, MS_REC | MS_SLAVE, nullptr) != 0)
-        return "mount of / as a slave";
+    return ::mount(nullptr, "/", nullptr, MS_REC | MS_SLAVE, nullptr) == 0 ? nullptr : "mount of / as a slave";
+}
+
+const char* stage(const std::vector<Mount>& mounts) {
+    std::vector<FileDescriptor> trees;
+    for (const Mount& mount : mounts) {
+        FileDescriptor& tree = trees.emplace_back();
+        if (mount.linkTarget.empty() && !(tree = copyOf(mount)).valid())
+            return "copy of a mount";
+    }
+    ::umask(0);
     if (::mount("tmpfs", stagingDirectory, "tmpfs", MS_NOSUID | MS_NODEV | MS_NOEXEC, "mode=0700") != 0)
         return "mount of a tmpfs on /mnt";
-    for (std::size_t i = 0; i < trees.size(); ++i) {
-        if (!trees[i].valid())
-            continue;
-        const std::string place = stagedPath(i);
-        if (::mkdir(place.c_str(), 0700) != 0)
-            return "mkdir";
-        if (::move_mount(trees[i].get(), "", AT_FDCWD, place.c_str(), MOVE_MOUNT_F_EMPTY_PATH) != 0)
-            return "move_mount";
-    }
-    for (std::size_t i = 0; i < memoryPlaces.size(); ++i) {
-        const std::string place = stagedMemoryPath(i);
-        if (::mkdir(place.c_str(), 0700) != 0 ||
-            ::mount("tmpfs", place.c_str(), "tmpfs", MS_NOSUID | MS_NODEV, memoryOptions) != 0)
+    if (::mkdir(stagedRoot, openMode) != 0 || ::mkdir(stagedMemory, openMode) != 0)
+        return "mkdir";
+    const FileDescriptor root(::open(stagedRoot, O_PATH | O_DIRECTORY | O_CLOEXEC));
+    if (!root.valid())
+        return "open";
+    for (const char* const name : emptyDirectories)
+        if (::mkdirat(root.get(), name, openMode) != 0)
+            return "mkdirat";
+    for (const std::string& place : {std::string(stagedRoot) + "/tmp", std::string(stagedMemory)})
+        if (::mount("tmpfs", place.c_str(), "tmpfs", memoryFlags, memoryOptions) != 0)
             return "mount of a tmpfs for what is shared in memory";
+    const FileDescriptor memory(::open(stagedMemory, O_PATH | O_DIRECTORY | O_CLOEXEC));
+    if (!memory.valid())
+        return "open";
+    Tree rootTree(root.get());
+    Tree memoryTree(memory.get());
+    for (std::size_t i = 0; i < mounts.size(); ++i) {
+        const std::string& path = mounts[i].path;
+        if (!mounts[i].linkTarget.empty()) {
+            if (::symlinkat(mounts[i].linkTarget.c_str(), root.get(), path.c_str() + 1) != 0)
+                return "symlinkat";
+            continue;
+        }
+        const bool isFile = mounts[i].isFile;
+        const FileDescriptor place = isAtOrBelow(path, memoryPlace)
+                                         ? memoryTree.place(path.substr(std::strlen(memoryPlace)), isFile)
+                                         : rootTree.place(path, isFile);
+        if (!place.valid())
+            return "mkdirat";
+        if (::move_mount(trees[i].get(), "", place.get(), "", MOVE_MOUNT_F_EMPTY_PATH | MOVE_MOUNT_T_EMPTY_PATH) != 0)
+            return "move_mount";
     }
     return nullptr;
 }

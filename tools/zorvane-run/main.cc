@@ -10,7 +10,10 @@
 #include "Notifications.h"
 #include "Options.h"
 #include "Output.h"
+#include "PassedSockets.h"
 #include "Registered.h"
+#include "Sandbox.h"
+#include "Staging.h"
 #include "Supervisor.h"
 #include "Upcall.h"
 #include "base/Try.h"
@@ -53,13 +56,26 @@ Result<Prepared> prepare(const Root& root, const Options& options) {
 
 /// Looks for an assertion before anything is made, and again when all is: that may have taken minutes. Whoever waited
 /// then prepares anew, for the containers may be others by now.
-Result<int> start(const Root& root, const Options& options) {
+Result<int> start(const Options& options) {
     Notifications notifications = TRY(Notifications::ofCaller());
+    if (const char* const failed = leaveMountNamespace())
+        return std::unexpected(noSandbox(failed));
+    const Root root = TRY(Root::open(options.root));
+    const PassedSockets passed = TRY(PassedSockets::ofCaller());
+    TRY(passed.judge(root, options));
     (void)TRY(awaitFreedom(root, options));
+    Supervisor supervisor = TRY(Supervisor::begin(options, passed));
     for (;;) {
         const Prepared prepared = TRY(prepare(root, options));
-        if (TRY(awaitFreedom(root, options)) == Freedom::found)
-            return runSandboxed(options, prepared.mounts, prepared.told, std::move(notifications));
+        if (TRY(awaitFreedom(root, options)) == Freedom::waitedFor)
+            continue;
+        const char* failed = stage(prepared.mounts);
+        if (!failed)
+            failed = notifications.appear();
+        if (failed)
+            return std::unexpected(noSandbox(failed));
+        const auto arguments = sandboxArguments(options, prepared.told, notifications, passed);
+        return supervisor.run(arguments, std::move(notifications));
     }
 }
 
@@ -77,9 +93,9 @@ Result<int> run(const Options& options) {
             Failure{.what = std::move(why) + ", which would lead the program out of its sandbox",
                     .advice = "give it a file, a pipe, a terminal or /dev/null; for a socket of the network, add "
                               "--network host"});
-    const Root root = TRY(Root::open(options.root));
     if (!options.dryRun)
-        return start(root, options);
+        return start(options);
+    const Root root = TRY(Root::open(options.root));
     const Prepared prepared = TRY(prepare(root, options));
     return showPlan(options, prepared.mounts, prepared.told);
 }
