@@ -262,8 +262,9 @@ bool ReplaceRecovery::mayComeBack(const FileURL& staged, const WaitingReplaces::
     if (!waiting.oldUrl.empty()) {
         const FileURL place = waiting.oldUrl.deletingLastPathComponent();
         return std::ranges::any_of(std::array{false, true}, [&](bool transient) {
-            return needs_.configuration.containerDirectoryURLForUser(atStake.userId, atStake.containerClass,
-                                                                     transient) == place;
+            const auto own =
+                needs_.configuration.containerDirectoryURLForUser(atStake.userId, atStake.containerClass, transient);
+            return !own || *own == place; // a home that cannot be looked for tells nothing
         });
     }
     struct stat status{};
