@@ -31,7 +31,8 @@ void put(const test::World& world, const std::string& path, const plist::Diction
 }
 
 struct OldDevice {
-    explicit OldDevice(platform::Disk& ofTheBoot) : disk(ofTheBoot), device("/dev/shm") {
+    explicit OldDevice(platform::Disk& ofTheBoot, Home home = Home::onRoot)
+        : disk(ofTheBoot), device("/dev/shm", home) {
         (void)device.marker.make();
         device.start(disk, journalEverywhere);
         test::World& world = device.daemon->world;
@@ -147,13 +148,17 @@ TEST(BootFaultTest, TheNextBootFinishesIt) {
     }
 }
 
-// Goal: the same wherever the power goes in that boot, on a file system that keeps order and on one that keeps none.
-// Method: the boot recorded once; each state that a cut after one of its calls may leave is booted twice.
+// Goal: the same wherever the power goes in that boot, on a file system that keeps order, on one that keeps none, and
+// between two. Method: the boot recorded once; each state that a cut after one of its calls may leave is booted twice.
 TEST(BootPowerCutTest, TheNextBootFinishesIt) {
-    for (const DiskModel model : {DiskModel::orderedJournal, DiskModel::unordered}) {
-        SCOPED_TRACE(model == DiskModel::unordered ? "unordered" : "ordered");
+    for (const auto& [model, home] :
+         {std::pair(DiskModel::orderedJournal, Home::onRoot), std::pair(DiskModel::unordered, Home::onRoot),
+          std::pair(DiskModel::orderedJournal, Home::mounted)}) {
+        SCOPED_TRACE(model == DiskModel::unordered ? "unordered" : home == Home::mounted ? "home" : "ordered");
+        if (home == Home::mounted && !test::MountedHome::canBe())
+            continue; // needs root
         platform::LinuxDisk linuxDisk;
-        OldDevice old(linuxDisk);
+        OldDevice old(linuxDisk, home);
         Device& device = old.device;
         RecordingDisk disk(linuxDisk, device.root.path(), {"run"});
         disk.start();

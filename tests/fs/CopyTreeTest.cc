@@ -229,6 +229,17 @@ TEST(CopyTree, RefusesWhatItCannotCopy) {
     EXPECT_EQ(copyTree(world.disk, world.fd(), "tree/device", world.fd(), ".copy2").number(), EPERM);
 }
 
+// An item that somebody puts in the place of a new link is not given away.
+TEST(CopyTree, GivesAwayOnlyTheLinkItMade) {
+    World world;
+    makeItems(world.fd(), {"tree/", "tree/l -> x", "victim"});
+    if (::fchownat(world.fd(), "tree/l", 501, 501, AT_SYMLINK_NOFOLLOW) != 0)
+        GTEST_SKIP() << "needs root";
+    support::ExchangingDisk disk(world.disk, support::DiskCall::makeSymbolicLink, world.path() + "/victim");
+    EXPECT_EQ(copyTree(disk, world.fd(), "tree", world.fd(), ".copy").number(), ESTALE);
+    EXPECT_EQ(statusOf(world.fd(), ".copy/l").st_uid, ::geteuid());
+}
+
 // A file of another owner below a directory that others can read is never readable in the half-made copy.
 TEST(CopyTree, IsClosedToOthersUntilItIsWhole) {
     World world;

@@ -399,6 +399,13 @@ TEST_F(DeathRow, AnothersDirectoryInAContainersPlace) {
                 }
                 return false;
             };
+            // A pass waits for the judgement of what comes to death row.
+            world.disk().before = [&](const DiskCallInfo& call) {
+                if (!meanwhile || call.call != DiskCall::rename || !call.subject.ends_with(" -> " + nameOf(place)))
+                    return;
+                world.daemonsClient().deleteContainersOnDeathRowWithCompletion(nullptr);
+                std::this_thread::sleep_for(std::chrono::milliseconds(100));
+            };
             if (meanwhile)
                 world.disk().arm({.filter = swap});
             else
@@ -409,6 +416,7 @@ TEST_F(DeathRow, AnothersDirectoryInAContainersPlace) {
                 (void)world.stage(container);
             world.drainDeathRow();
             world.disk().disarm();
+            world.disk().before = nullptr;
             EXPECT_TRUE(swapped);
             EXPECT_EQ(world.pass(), ErrorCode::success);
             EXPECT_TRUE(isThere(place + "/file"));

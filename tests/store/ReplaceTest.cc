@@ -126,6 +126,7 @@ TEST_F(Replace, EveryStateOfTheTableIsRecovered) {
         std::vector<std::string> there; // each holds a file that says where it was put
         std::array<std::string, 4> paths;
         std::map<std::string, std::string> after; // place to what it must hold
+        bool waits = false;
     };
     const std::array<std::string, 4> paths = {old, fresh, waiting, dest};
     const std::array<std::string, 4> preserving = {old, fresh, waiting, old};
@@ -144,6 +145,7 @@ TEST_F(Replace, EveryStateOfTheTableIsRecovered) {
         {": nothing was waiting any more", {old}, preserving, {{old, old}}},
         {": nothing is left", {}, paths, {}},
         {"Invalid replace data", {waiting, fresh}, {old, "", waiting, dest}, {{fresh, fresh}}},
+        {"Failed to recover", {waiting}, {old, fresh, waiting, behindLink[0]}, {}, true},
     };
     world.makeDirectories(applications, mobile);
     world.link("elsewhere", applications + "/loop");
@@ -159,11 +161,11 @@ TEST_F(Replace, EveryStateOfTheTableIsRecovered) {
             if (world.exists(place))
                 after[place] = world.read(place + "/content");
         EXPECT_EQ(after, row.after);
-        EXPECT_TRUE(isQuiet());
+        EXPECT_EQ(isQuiet(), !row.waits);
         EXPECT_TRUE(std::ranges::any_of(world.log.take(), [&](const support::LogLine& line) {
             return line.level <= 5 && line.message.find(row.said) != std::string::npos;
         }));
-        for (const std::string& place : {old, fresh, dest})
+        for (const std::string& place : {old, fresh, dest, staging, journals})
             std::filesystem::remove_all(world.path(place));
     }
 }
@@ -217,22 +219,36 @@ TEST_F(Replace, ARecoveryThatStopsKeepsWhatItStillNeeds) {
 }
 
 // Goal: a sync that fails loses no container and brings none back; what is answered is so. Method: a file system
-// without order, on which the n-th sync of a replace fails, or all from there on; then a deletion and a launch.
+// without order, on which the n-th sync of a replace fails, or all from there on, or memory runs out there; then a
+// deletion and a launch.
 TEST_F(ReplaceWithoutOrder, ASyncThatFailsLosesNothing) {
     const std::string identifier = "synced";
     int undone = 0;
     int waited = 0;
-    for (const FaultSpan span : {FaultSpan::once, FaultSpan::fromThenOn})
+    enum class Way { once, fromThenOn, thrown };
+    for (const Way way : {Way::once, Way::fromThenOn, Way::thrown})
         for (const Preserve preserve : {Preserve::no, Preserve::yes}) {
             bool met = true;
             for (std::size_t point = 1; met; ++point) {
                 SCOPED_TRACE(point);
                 const FoundContainer old = make(identifier, false);
                 const FoundContainer fresh = make(identifier, asTransient);
-                world.disk().arm({.point = point, .span = span, .filter = isSync});
+                bool thrown = false;
+                world.disk().arm({.point = point,
+                                  .span = way == Way::fromThenOn ? FaultSpan::fromThenOn : FaultSpan::once,
+                                  .filter = [&, syncs = std::size_t{0}](const DiskCallInfo& call) mutable {
+                                      if (!isSync(call) || way != Way::thrown)
+                                          return isSync(call);
+                                      if (++syncs != point)
+                                          return false;
+                                      thrown = true;
+                                      throw std::bad_alloc();
+                                  }});
                 const auto replaced = world.replace(&old, fresh, preserve);
-                met = world.disk().met();
+                met = world.disk().met() || thrown;
                 EXPECT_EQ(replaced.has_value(), !met);
+                if (way == Way::thrown)
+                    (void)world.find(identifier); // what waits is settled
                 const auto live = world.services().cache().containerForUser(mobile, application, &identifier, false);
                 ASSERT_TRUE(live);
                 const std::string content = world.read(world.relative((*live)->url().path()) + "/content");

@@ -6,6 +6,7 @@
 #include "os/FileDescriptor.h"
 #include "platform/Disk.h"
 #include "platform/Errno.h"
+#include "support/Files.h"
 
 #include <cerrno>
 #include <fcntl.h>
@@ -148,6 +149,26 @@ private:
     }
 
     platform::Disk& inner_;
+};
+
+/// Puts another item in the place of each new one of a kind, before anybody can open it.
+class ExchangingDisk final : public InterceptedDisk {
+public:
+    /// `prefix`: how the new one's name begins.
+    ExchangingDisk(Disk& inner, DiskCall call, std::string other, std::string prefix = "")
+        : InterceptedDisk(inner), call_(call), other_(std::move(other)), prefix_(std::move(prefix)) {}
+
+private:
+    Errno intercept(const DiskCallInfo& info, const Make& make) override {
+        const Errno made = make();
+        if (info.call == call_ && info.subject.starts_with(prefix_))
+            checked(::renameat2(AT_FDCWD, other_.c_str(), info.fd, info.subject.c_str(), RENAME_EXCHANGE), other_);
+        return made;
+    }
+
+    const DiskCall call_;
+    const std::string other_;
+    const std::string prefix_;
 };
 
 } // namespace zor::support
