@@ -1,6 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// Error values and their one line, the level gate, the boundary where exceptions end, names that are encoded.
-#include "base/Format.h"
+// Error values and their one line, the boundary where exceptions end.
 #include "base/ZORError.h"
 #include "device/FileCrashAnnotation.h"
 #include "os/SystemRoot.h"
@@ -39,28 +38,6 @@ concept TakenForANumber = requires(T error) { -error; } || requires(T error) { e
                           std::convertible_to<T, int> || std::convertible_to<T, bool>;
 static_assert(!TakenForANumber<Errno>);
 
-// An error is no number of any sign, and is handed on from whatever carries it to whatever can.
-TEST(Error, NumberIsPositiveAndHandedOn) {
-    const auto value = [](int number) { return number == 0 ? ErrnoOr<int>(7) : Errno(number); };
-    const auto number = [&](int failure) -> Errno { return Errno(TRY(value(failure)) - 7); };
-    const auto word = [&](int failure) -> ErrnoOr<std::string> { return std::to_string(TRY(value(failure))); };
-    EXPECT_TRUE(!number(0) && number(ENOENT) == ENOENT && word(0).value() == "7" && word(EIO).error() == EIO);
-    EXPECT_DEATH((void)Errno(-ENOENT), "");
-}
-
-// Every handle state (0: no handle) against every level; a line that is not written has its arguments not evaluated.
-TEST(Log, LevelGate) {
-    for (const auto& [handleLevel, written] : {std::pair(0, "35"), {3, "3"}, {5, "35"}, {6, "35"}, {7, "357"}}) {
-        support::RecordingLog sink(handleLevel);
-        const Log log(sink);
-        std::string evaluated;
-        for (const int level : {3, 5, 7})
-            ZOR_LOG(log, level, "%s", (evaluated += std::to_string(level)).c_str());
-        EXPECT_EQ(evaluated, written) << handleLevel;
-        EXPECT_EQ(sink.take().size(), evaluated.size()) << handleLevel;
-    }
-}
-
 // On an internal build the process dies with the first report in its file: a child whose threads all fail at once.
 TEST(ExceptionBoundary, AnInternalBuildAbortsWithTheFirstReport) {
     const support::TestRoot root;
@@ -89,23 +66,6 @@ TEST(ExceptionBoundary, AnInternalBuildAbortsWithTheFirstReport) {
                                    "Exception: <worker> Range: 5 beyond 4\nStack:\n"))
         << report;
     EXPECT_EQ(report.find("INTERNAL ERROR", 5), std::string::npos) << "a second report was written";
-}
-
-// Any string is one visible path component, and no two are the same.
-TEST(PercentEncoding, IsOneComponentAndReversible) {
-    const std::pair<std::string, const char*> cases[] = {{"com.App-1_b", "com.App-1_b"},
-                                                         {"..", "%2E."},
-                                                         {"a/b", "a%2Fb"},
-                                                         {"%2E", "%252E"},
-                                                         {"\xc3\xa9", "%C3%A9"},
-                                                         {"a b\n", "a%20b%0A"},
-                                                         {std::string("\0", 1), "%00"}};
-    for (const auto& [text, encoded] : cases) {
-        EXPECT_EQ(platform::percentEncode(text), encoded);
-        EXPECT_EQ(platform::percentDecode(encoded), text);
-    }
-    for (const char* wrong : {"%", "%2", "%2e", "%GG", ".x", "a/b", "%41", "a b"})
-        EXPECT_EQ(platform::percentDecode(wrong), std::nullopt) << wrong;
 }
 
 } // namespace

@@ -31,7 +31,9 @@ private:
     const std::uint32_t mobile_;
 };
 
-// The first matching rule decides: the resolved user, or none for error 38 and its one line.
+// The first matching rule decides: the resolved user, or none for error 38 and its one line. Bundle and system classes
+// have their owner, whoever asks; for system clients 1 is the mobile user whatever the class, others go by the table of
+// owners; mobile clients act as themselves; a class of more than 32 bits is none.
 TEST(UserIdentity, RequestsResolveByClassAndClient) {
     struct Row {
         std::uint32_t requested;
@@ -39,40 +41,16 @@ TEST(UserIdentity, RequestsResolveByClassAndClient) {
         std::uint32_t client;
         std::optional<std::uint32_t> resolved;
     };
-    const Row rows[] = {// Bundle and system classes: the owner, whoever asks.
-                        {33, 1, 0, 33},
-                        {33, 8, 501, 33},
-                        {1, 1, 0, {}},
-                        {1, 1, 501, {}},
-                        {501, 5, 501, {}},
-                        {501, 3, 0, {}},
-                        {499, 12, 0, 499},
-                        {499, 13, 501, 499},
-                        {1, 12, 0, {}},
-                        {501, 13, 501, {}},
-                        {505, 12, 0, {}},
-                        // System clients: 1 is the mobile user whatever the class, others by the table of owners.
-                        {1, 2, 0, 507},
-                        {1, 2, 500, 507},
-                        {1, 0, 0, 507},
-                        {1, 14, 0, 507},
-                        {505, 2, 0, 505},
-                        {510, 11, 499, 510},
-                        {511, 2, 0, {}},
-                        {500, 2, 0, {}},
-                        {0, 2, 0, {}},
-                        {501, 14, 0, {}},
-                        // Mobile clients act as themselves.
-                        {1, 2, 501, 501},
-                        {501, 2, 501, 501},
-                        {502, 2, 501, {}},
-                        {0, 2, 501, {}},
-                        {1, 0, 501, 501},
-                        {1, 99, 777, 777},
-                        {777, 2, 777, 777},
-                        {507, 7, 501, {}},
-                        // A class of more than 32 bits is none of these.
-                        {501, (std::uint64_t{1} << 32) + 2, 0, {}}};
+    const Row rows[] = {{33, 1, 0, 33},     {33, 8, 501, 33},    {1, 1, 0, {}},
+                        {1, 1, 501, {}},    {501, 5, 501, {}},   {501, 3, 0, {}},
+                        {499, 12, 0, 499},  {499, 13, 501, 499}, {1, 12, 0, {}},
+                        {501, 13, 501, {}}, {505, 12, 0, {}},    {1, 2, 0, 507},
+                        {1, 2, 500, 507},   {1, 0, 0, 507},      {1, 14, 0, 507},
+                        {505, 2, 0, 505},   {510, 11, 499, 510}, {511, 2, 0, {}},
+                        {500, 2, 0, {}},    {0, 2, 0, {}},       {501, 14, 0, {}},
+                        {1, 2, 501, 501},   {501, 2, 501, 501},  {502, 2, 501, {}},
+                        {0, 2, 501, {}},    {1, 0, 501, 501},    {1, 99, 777, 777},
+                        {777, 2, 777, 777}, {507, 7, 501, {}},   {501, (std::uint64_t{1} << 32) + 2, 0, {}}};
     for (const Row& row : rows) {
         support::RecordingLog sink(logLevelNotice);
         const Log log(sink);

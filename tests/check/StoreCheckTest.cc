@@ -60,7 +60,7 @@ struct Store {
     /// Beside the container.
     [[nodiscard]] std::string sibling(const std::string& name) const { return classDirectory() + "/" + name; }
     [[nodiscard]] std::string classDirectory() const { return files::path(data).parent_path(); }
-    void setMetadata(const char* key, plist::Value value) const {
+    void setMetadata(const std::string& key, plist::Value value) const {
         plist::Dictionary content = test::metadataOf(2, 501, "org.data", uuid);
         content.set(key, std::move(value));
         std::ofstream(metadata(), std::ios::binary) << test::binary(content);
@@ -114,6 +114,15 @@ void giveAway(const std::string& path, uid_t user) {
     EXPECT_EQ(::chown(path.c_str(), user, user), 0);
 }
 
+/// A metadata file that no reader takes, by which rule.
+Damage invalid(const char* name, std::function<void(Store&)> inflict, const char* rule = "readable") {
+    return {name, std::move(inflict), FindingCode::metadataInvalid, Mender::person, "", rule};
+}
+
+std::function<void(Store&)> with(const char* key, const plist::Value& value) {
+    return [=](Store& store) { store.setMetadata(std::string("ZORMetadata") + key, value); };
+}
+
 std::vector<Damage> damages() {
     using enum FindingCode;
     using enum Mender;
@@ -121,28 +130,20 @@ std::vector<Damage> damages() {
     static const std::string mapping = "sandbox/501/1/";
     std::vector<Damage> rows = {
         {"no metadata", [](S s) { files::remove(s.metadata()); }, metadataMissing, boot},
-        {"garbage", [](S s) { std::ofstream(s.metadata()) << "x"; }, metadataInvalid, person, "", "readable"},
-        {"two names", [](S s) { files::create_hard_link(s.metadata(), s.data + "/second"); }, metadataInvalid, person,
-         "", "readable"},
-        {"writable", [](S s) { ::chmod(s.metadata().c_str(), 0666); }, metadataInvalid, person, "", "readable"},
-        {"a link to it", [](S s) { replaceByLink(s.metadata(), "/etc/passwd"); }, metadataInvalid, person, "",
-         "readable"},
-        {"a FIFO", [](S s) { replaceByFifo(s.metadata()); }, metadataInvalid, person, "", "readable"},
-        {"no identifier", [](S s) { s.setMetadata("ZORMetadataIdentifier", 7); }, metadataInvalid, person, "",
-         "identifier"},
-        {"an identifier that is too long", [](S s) { s.setMetadata("ZORMetadataIdentifier", std::string(1025, 'i')); },
-         metadataInvalid, person, "", "identifier"},
-        {"a UUID in braces", [](S s) { s.setMetadata("ZORMetadataUUID", "{0000000-0000-4000-8000-000000000001}"); },
-         metadataInvalid, person, "", "uuid"},
-        {"a class cut to 32 bits", [](S s) { s.setMetadata("ZORMetadataContentClass", std::int64_t{4294967298}); },
-         metadataInvalid, person, "", "class"},
-        {"no UUID", [](S s) { s.setMetadata("ZORMetadataUUID", "x"); }, metadataInvalid, person, "", "uuid"},
-        {"no class", [](S s) { s.setMetadata("ZORMetadataContentClass", 99); }, metadataInvalid, person, "", "class"},
-        {"no info", [](S s) { s.setMetadata("ZORMetadataInfo", plist::Array()); }, metadataInvalid, person, "", "info"},
-        {"another user's", [](S s) { s.setMetadata("ZORMetadataPersona", 502); }, wrongClassDirectory, person, "",
-         "user"},
-        {"another class's", [](S s) { s.setMetadata("ZORMetadataContentClass", 4); }, wrongClassDirectory, person, "",
-         "place"},
+        invalid("garbage", [](S s) { std::ofstream(s.metadata()) << "x"; }),
+        invalid("two names", [](S s) { files::create_hard_link(s.metadata(), s.data + "/second"); }),
+        invalid("writable", [](S s) { ::chmod(s.metadata().c_str(), 0666); }),
+        invalid("a link to it", [](S s) { replaceByLink(s.metadata(), "/etc/passwd"); }),
+        invalid("a FIFO", [](S s) { replaceByFifo(s.metadata()); }),
+        invalid("no identifier", with("Identifier", 7), "identifier"),
+        invalid("an identifier that is too long", with("Identifier", std::string(1025, 'i')), "identifier"),
+        invalid("a UUID in braces", with("UUID", "{0000000-0000-4000-8000-000000000001}"), "uuid"),
+        invalid("a class cut to 32 bits", with("ContentClass", std::int64_t{4294967298}), "class"),
+        invalid("no UUID", with("UUID", "x"), "uuid"),
+        invalid("no class", with("ContentClass", 99), "class"),
+        invalid("no info", with("Info", plist::Array()), "info"),
+        {"another user's", with("Persona", 502), wrongClassDirectory, person, "", "user"},
+        {"another class's", with("ContentClass", 4), wrongClassDirectory, person, "", "place"},
         {"copied", [](S s) { EXPECT_EQ(std::system(("cp -a " + s.data + " " + s.sibling(uuid)).c_str()), 0); },
          doubledContainer, person},
         {"renamed", [](S s) { files::rename(s.data, s.sibling("Junk")); }, containerName, boot, "/Junk"},
@@ -222,11 +223,10 @@ std::vector<Damage> damages() {
     if (::geteuid() != 0)
         return rows;
     // The daemon gives nothing of another's away.
-    rows.push_back({"another's subdirectory", [](S s) { giveAway(s.data + "/tmp", 502); }, subdirectoryAttributes,
-                    person, "/tmp"});
-    rows.push_back({"root's container", [](S s) { giveAway(s.group, 0); }, containerAttributes, person});
-    rows.push_back(
-        {"a user's metadata", [](S s) { giveAway(s.metadata(), 501); }, metadataInvalid, person, "", "readable"});
+    rows.insert(rows.end(), {{"another's subdirectory", [](S s) { giveAway(s.data + "/tmp", 502); },
+                              subdirectoryAttributes, person, "/tmp"},
+                             {"root's container", [](S s) { giveAway(s.group, 0); }, containerAttributes, person},
+                             invalid("a user's metadata", [](S s) { giveAway(s.metadata(), 501); })});
     return rows;
 }
 

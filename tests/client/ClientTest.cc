@@ -5,7 +5,6 @@
 #include "ipc/Protocol.h"
 #include "support/FakeServer.h"
 #include "support/Frames.h"
-#include "zorvane/Text.h"
 
 #include <gtest/gtest.h>
 
@@ -252,35 +251,11 @@ TEST(Client, NobodyThere) {
     expectUnreachable(optionsOf(gone.root()));
 }
 
-// Goal: a name can neither steer a terminal nor move a column. Method: what a log line escapes.
-TEST(Client, NamesAreMadePrintable) {
-    for (const auto& [name, shown] : std::initializer_list<std::pair<std::string, std::string>>{
-             {"caf\xc3\xa9", "caf\xc3\xa9"},
-             {"\xc2\x9b"
-              "31m",
-              "\\xc2\\x9b31m"},
-             {"\x9b"
-              "31m",
-              "\\x9b31m"},
-             {"two\nlines\tand\x1b", "two\\nlines\\x09and\\x1b"},
-             {"gnp.\u202Egpj", "gnp.\\xe2\\x80\\xaegpj"},
-         })
-        EXPECT_EQ(printable(name), shown);
-}
-
 TEST(Client, RootsOfAnyLength) {
     for (const std::size_t depth : {48U, 49U, 50U, 51U, 52U, 53U, 54U, 55U, 250U}) {
         const ScriptedDaemon daemon([](int socket, std::uint64_t id) { put(socket, reply(found(), id)); }, depth);
         EXPECT_TRUE(daemon.connect().createOrLookup({.containerClass = 2, .identifier = "a.b"})) << depth;
     }
-}
-
-// Every code of the protocol has words of its own.
-TEST(Client, EveryCodeHasItsWords) {
-    const std::string unknown = errorText(0).meaning;
-    for (const std::uint64_t code : {1,  4,  5,  6,  7,  8,  9,  10, 11, 12, 14, 15, 17, 18, 21, 22, 23, 24, 27, 28, 29,
-                                     33, 34, 35, 36, 38, 40, 41, 43, 44, 45, 46, 47, 48, 49, 55, 56, 59, 60, 61, 62})
-        EXPECT_TRUE(errorText(code).meaning != unknown && *errorText(code).advice != '\0') << code;
 }
 
 } // namespace

@@ -21,29 +21,6 @@ namespace {
 using support::eventually;
 using support::TestRoot;
 
-TEST(DeviceQueries, ReadReleaseFiles) {
-    const std::pair<const char*, const char*> cases[] = {
-        {"BUILD_ID=21A42\nVERSION_ID=3\n", "21A42"},
-        {"BUILD_ID=\"\"\nVERSION_ID='12 \"b\"'\n", "12 \"b\""},
-        {"BUILD_ID=\"a\\\"b\\$c\\\\d\\n\"", "a\"b$c\\d\\n"},
-        {"# BUILD_ID=comment\nXBUILD_ID=1\nBUILD_IDX=2\nVERSION_ID=7", "7"},
-        {"BUILD_ID=\"open\n", "\"open"},
-    };
-    const TestRoot test;
-    const auto version = [&] { return LinuxSystemVersionQuery(test.root()).buildVersion(); };
-    for (const auto& [text, expected] : cases) {
-        test.write(names::operatingSystemRelease, text);
-        EXPECT_EQ(version(), expected) << text;
-    }
-    // A link in a tree that only root writes to counts, and ends below the root; a FIFO holds nobody up.
-    test.write("usr/lib/os-release", "BUILD_ID=linked\n");
-    const std::string file = test.path(names::operatingSystemRelease);
-    ASSERT_EQ(::unlink(file.c_str()) | ::symlink("/usr/lib/os-release", file.c_str()), 0);
-    EXPECT_EQ(version(), "linked");
-    ASSERT_EQ(::unlink(file.c_str()) | ::mkfifo(file.c_str(), 0644), 0);
-    EXPECT_EQ(version(), "");
-}
-
 // The marker is per root, and only one of ours counts, not what others could plant. Each mark is judged without the
 // other one.
 TEST(BootMarker, BelievesOnlyItsOwn) {

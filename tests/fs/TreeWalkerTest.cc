@@ -29,34 +29,6 @@ std::set<std::string> visits(TreeWalker& walker, int parent, const char* name) {
     return seen;
 }
 
-// Every kind of item, each directory before and after what it holds; links are not followed, dangling or not.
-TEST(TreeWalker, VisitsEveryItemOfATree) {
-    const TemporaryDirectory directory;
-    const FileDescriptor root = openDirectory(directory.path());
-    makeItems(root.get(), {"tree/", "tree/empty/", "tree/full/", "tree/full/.hidden", "tree/full/dangling -> nowhere",
-                           "tree/full/up -> ..", "tree/fifo|"});
-    ASSERT_EQ(::mknodat(root.get(), "tree/socket", S_IFSOCK | 0600, 0), 0);
-    const std::set<std::string> expected = {
-        "directory ",        "directory empty",    "directory full", "end ",       "end empty",   "end full",
-        "file full/.hidden", "link full/dangling", "link full/up",   "other fifo", "other socket"};
-    for (const WalkStatus status : {WalkStatus::full, WalkStatus::typeOnly}) {
-        TreeWalker walker(status);
-        EXPECT_EQ(visits(walker, root.get(), "tree"), expected);
-        const FileDescriptor tree = openDirectory(root.get(), "tree");
-        EXPECT_EQ(visits(walker, tree.get(), "."), expected);
-        EXPECT_EQ(visits(walker, root.get(), "tree/full/.hidden"), std::set<std::string>{"file "});
-        EXPECT_EQ(visits(walker, root.get(), "tree/full/up"), std::set<std::string>{"link "});
-    }
-    TreeWalker walker;
-    const auto proceed = [](const WalkEntry&) { return WalkStep::proceed; };
-    EXPECT_EQ(walker.walk(root.get(), "missing", proceed).number(), ENOENT);
-    EXPECT_EQ(walker
-                  .walk(root.get(), "tree",
-                        [](const WalkEntry& e) { return e.depth > 0 ? WalkStep::stop : WalkStep::proceed; })
-                  .number(),
-              ECANCELED);
-}
-
 // Directories moved away while the walk is below them, deeper than it keeps descriptors: it goes on where it may,
 // leaves what is lost, and never goes up into the place they were moved to.
 TEST(TreeWalker, GoesUpOnlyIntoDirectoriesItCameFrom) {

@@ -61,27 +61,6 @@ TEST(SerialWorkQueue, BeginsNothingWhileSuspended) {
     }
 }
 
-// When the queue goes, jobs run, also those that jobs queue, or are dropped when it is suspended; no job is leaked.
-TEST(SerialWorkQueue, FinishesOrDropsWhatIsQueued) {
-    const auto held = std::make_shared<int>(0);
-    for (const bool suspended : {false, true}) {
-        std::atomic<int> ran{0};
-        {
-            SerialWorkQueue queue("com.veltra.test");
-            ASSERT_TRUE(queue.start());
-            if (suspended)
-                queue.suspend();
-            for (int i = 0; i < 10; ++i)
-                queue.async([&, held] { queue.async([&, held] { ++ran; }); });
-            if (!suspended)
-                queue.finish();
-            queue.async([&, held] { ++ran; });
-        }
-        EXPECT_EQ(ran.load(), suspended ? 0 : 10);
-    }
-    EXPECT_EQ(held.use_count(), 1);
-}
-
 // A callback that unwatches another one whose event is already fetched prevents it; a descriptor number that is used
 // again is not mistaken for the old one.
 TEST(RunLoop, CallsOnlyWhatIsStillWatched) {

@@ -148,36 +148,6 @@ void expectReason(const std::expected<Value, ReadError>& result, const char* rea
         << reason << " but " << result.error().text();
 }
 
-// Goal: a dictionary stays sorted with unique keys through every change. Method: changes in a bad order.
-TEST(Value, DictionaryStaysSorted) {
-    Dictionary entries{{"m", 1}, {"z", 2}, {"a", 3}, {"m", 4}};
-    entries.set("b", 5);
-    entries.set("z", 6);
-    EXPECT_TRUE(entries.erase("a") && !entries.erase("a") && !entries.erase("n") && !entries.find("mm"));
-    std::vector<std::string> keys;
-    for (const auto& [key, value] : entries)
-        keys.push_back(key);
-    EXPECT_EQ(keys, (std::vector<std::string>{"b", "m", "z"}));
-    EXPECT_EQ(entries, (Dictionary{{"z", 6}, {"m", 4}, {"b", 5}}));
-}
-
-// Goal: typed reads never take one type for another. Method: every getter on a key of every type.
-TEST(Value, TypedReads) {
-    const Dictionary entries{{"boolean", true}, {"string", "s"},
-                             {"data", Data{1}}, {"array", Array{}},
-                             {"one", 1},        {"dictionary", Dictionary{}},
-                             {"negative", -1},  {"big", ~std::uint64_t{0}}};
-    for (const auto& [key, value] : entries) {
-        EXPECT_EQ(entries.string(key) != nullptr, key == "string");
-        EXPECT_EQ(entries.data(key) != nullptr, key == "data");
-        EXPECT_EQ(entries.array(key) != nullptr, key == "array");
-        EXPECT_EQ(entries.dictionary(key) != nullptr, key == "dictionary");
-        EXPECT_EQ(entries.isTrue(key), key == "boolean");
-        EXPECT_EQ(entries.unsignedInteger(key).has_value(), key == "one" || key == "big");
-        EXPECT_EQ(value.asSigned().has_value(), key == "one" || key == "negative");
-    }
-}
-
 // Goal: a scalar has exactly the bytes of the format. Method: hand-derived object bytes, both directions.
 TEST(BinaryForm, ScalarsBothWays) {
     for (const auto& [value, object] : scalars()) {

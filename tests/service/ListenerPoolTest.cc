@@ -86,61 +86,6 @@ TEST(ListenerPool, GrowsWhileHandlersWaitAndShrinksAfterwards) {
     }
 }
 
-// With a tick of an hour: the pool reacts at once in the three ways in which work can be left without a worker.
-TEST(ListenerPool, GrowsAtOnceWhenWorkersSaySo) {
-    ListenerWorld world;
-    world.limits.threadsRunning = 2;
-    world.limits.tick = std::chrono::hours(1);
-    Gate working;
-    Gate blocked;
-    std::atomic<int> floodServed{0};
-    world.start([&](PeerConnection&, ServiceEvent& event) {
-        if (!event.reply) {
-            ++floodServed;
-            return;
-        }
-        const std::uint64_t number = event.request.unsignedInteger("Number").value_or(0);
-        if (number == 1 || number == 3)
-            working.wait(Announced::no);
-        if (number == 1 || number == 2)
-            blocked.wait(Announced::yes);
-        event.reply->send(event.request);
-    });
-    std::vector<RawClient> clients;
-    const auto request = [&](std::uint64_t number) {
-        clients.push_back(world.connect());
-        ASSERT_TRUE(clients.back().send(numbered(number), number));
-    };
-    RawClient other = world.connect();
-    // Nobody waits any more when these two say that they block.
-    request(1);
-    request(1);
-    ASSERT_TRUE(working.holds(2));
-    working.open(1);
-    ASSERT_TRUE(blocked.holds(1));
-    EXPECT_TRUE(other.isServed());
-    working.open(1);
-    ASSERT_TRUE(blocked.holds(2));
-    EXPECT_TRUE(other.isServed());
-    // One blocks while another waits; then that one works, and another may run beside it.
-    request(2);
-    ASSERT_TRUE(blocked.holds(3));
-    request(3);
-    ASSERT_TRUE(working.holds(1));
-    EXPECT_TRUE(other.isServed());
-    EXPECT_EQ(world.counters().threads, 5U);
-    // Requests that wait for their turn are taken over when the worker that left them there gets busy.
-    std::thread sender([&] { EXPECT_TRUE(other.send(burstOf(2000, 0))); });
-    working.open(1);
-    request(3);
-    EXPECT_TRUE(eventually([&] { return floodServed == 2000; }) && working.holds(1));
-    sender.join();
-    working.open();
-    blocked.open();
-    for (RawClient& client : clients)
-        EXPECT_TRUE(client.receive());
-}
-
 // Clients that leave at any moment, while replies come at once, late, large or never, leave no charge, no event and no
 // reply to a later connection of the same object.
 TEST(ListenerPool, ConnectionsEndWhileRepliesAreUnderWay) {

@@ -15,16 +15,6 @@ namespace {
 
 namespace files = std::filesystem;
 
-constexpr std::uint32_t lateUser = 504;
-constexpr const char* lateIdentifier = "org.soak.late";
-constexpr const char* lateGroup = "group.org.soak.late";
-constexpr const char* twinIdentifier = "org.soak.twin";
-constexpr const char* keptName = "kept";
-
-zorvane::Client::Lookup lateLookup() {
-    return {.containerClass = whole::dataApplication, .user = lateUser, .identifier = lateIdentifier, .create = true};
-}
-
 /// Whether a store in use may have the finding: clients take directories away, a kill comes amid a change of the
 /// protection class, errors leave what the next start clears.
 bool isAllowed(const nlohmann::json& finding) {
@@ -38,35 +28,15 @@ bool isAllowed(const nlohmann::json& finding) {
 } // namespace
 
 Surroundings::Surroundings(Session& session, std::uint64_t seed, bool diskCanBeFilled)
-    : session_(session), choices_(seed, 2000), diskCanBeFilled_(diskCanBeFilled),
-      home_(session.root() + "/private/var/late") {
-    std::ofstream(session.root() + "/etc/passwd", std::ios::app) << "late:x:504:504::/private/var/late:/bin/sh\n";
-    files::create_directories(home_);
-    if (::geteuid() == 0)
-        (void)!::chown(home_.c_str(), lateUser, lateUser);
-    files::create_directories(session.root() + "/bin");
-    for (const char* name : {"one", "two"}) {
-        const std::string program = session.root() + "/bin/" + name;
-        files::copy_file(whole::programPath("zorvanectl"), program);
-        session.daemon().registerProgram(std::string("30-") + name, program,
-                                         "<key>Entitlements</key><dict><key>com.veltra.security.application-groups"
-                                         "</key><array><string>group.org.soak.twin." +
-                                             std::string(name) + "</string></array></dict>",
-                                         twinIdentifier);
-    }
-}
+    : session_(session), choices_(seed, 2000), diskCanBeFilled_(diskCanBeFilled) {}
 
 void Surroundings::happen(unsigned pauseMillisecondsMax) {
     sleepMilliseconds(1 + choices_.upTo(pauseMillisecondsMax));
     const auto lot = choices_.upTo(100);
-    if (lot < 62)
+    if (lot < 66)
         kill();
-    else if (lot < 70)
+    else if (lot < 77)
         boot();
-    else if (lot < 75)
-        oneOfTwoSpeaks(choices_.oneIn(2));
-    else if (lot < 78)
-        bootWithoutAHome();
     else if (lot < 82)
         hang();
     else if (lot < 90)
@@ -205,81 +175,6 @@ Surroundings::Size Surroundings::size() const {
         if (line.starts_with("VmRSS:"))
             size.residentKiB = std::stoul(line.substr(6));
     return size;
-}
-
-std::optional<zorvane::Client> Surroundings::client() const {
-    std::optional<zorvane::Client> client;
-    for (int tries = 0; !client && tries < 1000 && !session_.stopped; ++tries)
-        session_.connect(client);
-    return client;
-}
-
-bool Surroundings::hold() {
-    auto asking = client();
-    if (!asking)
-        return false;
-    const zorvane::List groups{zorvane::Value{std::string(lateGroup)}};
-    const auto registered = asking->processEntitlements(
-        {.identifier = lateIdentifier,
-         .entitlements = zorvane::Map{{"com.veltra.security.application-groups", zorvane::Value{groups}}}});
-    const auto made = asking->createOrLookup(lateLookup());
-    const auto paths = asking->groupContainerPaths(lateUser, lateIdentifier);
-    if (!registered || !made || !paths || !paths->contains(lateGroup)) {
-        session_.found("the user with the late home gets no containers: " + (!registered ? registered.error().message
-                                                                             : !made     ? made.error().message
-                                                                             : !paths    ? paths.error().message
-                                                                                         : "no group's"));
-        return false;
-    }
-    container_ = made->path;
-    group_ = paths->at(lateGroup);
-    whole::writeFile(container_ + "/" + keptName, "container");
-    whole::writeFile(group_ + "/" + keptName, "group");
-    return true;
-}
-
-void Surroundings::bootWithoutAHome() {
-    if (container_.empty() && !hold())
-        return;
-    session_.did("device", "home away");
-    files::rename(home_, home_ + ".away");
-    boot();
-    auto asking = client();
-    if (asking && asking->createOrLookup(lateLookup()))
-        session_.found("a container is served in a home that is away");
-    if (files::exists(home_))
-        session_.found("the daemon made the home that was away");
-    std::error_code error;
-    files::rename(home_ + ".away", home_, error);
-    if (error)
-        session_.found("the home cannot come back: " + error.message());
-    asking = client();
-    if (!asking)
-        return;
-    const auto there = asking->createOrLookup(lateLookup());
-    const auto paths = asking->groupContainerPaths(lateUser, lateIdentifier);
-    if (!there || there->path != container_ || whole::readFile(container_ + "/" + keptName) != "container")
-        session_.found("the container of the late home: " + (there ? there->path : there.error().message) + ", was " +
-                       container_);
-    if (!paths || !paths->contains(lateGroup) || paths->at(lateGroup) != group_ ||
-        whole::readFile(group_ + "/" + keptName) != "group")
-        session_.found("the group of the late home is not what it was");
-}
-
-void Surroundings::oneOfTwoSpeaks(bool first) {
-    session_.did("device", "one of two programs");
-    const auto outcome =
-        whole::runProgram({session_.root() + "/bin/" + (first ? "one" : "two"), "--root", session_.root(), "create",
-                           twinIdentifier, "--class", "data-app", "--user", std::to_string(whole::mobile)});
-    auto asking = client();
-    if (!asking)
-        return;
-    if (outcome.exitStatus != 0)
-        session_.found("a program of the registry gets no container: " + outcome.output);
-    const auto groups = asking->groupContainerIdentifiers(whole::mobile, twinIdentifier);
-    if (!groups || groups->size() != 2)
-        session_.found("of the groups of two programs " + (groups ? std::to_string(groups->size()) : "none") +
-                       " are registered");
 }
 
 } // namespace zor::soak

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // The events that the daemon meets: kills, orderly ends, boots, locks of the device, a full disk, too few descriptors,
-// homes that are missing, mounts that hang. And what must hold whenever the daemon starts again.
+// mounts that hang. And what must hold whenever the daemon starts again.
 #pragma once
 
 #include "soak/Session.h"
@@ -9,12 +9,9 @@ namespace zor::soak {
 
 class Surroundings {
 public:
-    /// Before the daemon starts: the user whose home comes and goes, the two programs and their entries.
     Surroundings(Session& session, std::uint64_t seed, bool diskCanBeFilled);
     /// One event, after a random time below this.
     void happen(unsigned pauseMillisecondsMax);
-    /// One of two programs of one application, each entitled to a group, speaks; the groups of both must be there.
-    void oneOfTwoSpeaks(bool first);
     /// Ends all trouble.
     void settle();
     /// With the clients silent: `zorvanectl check` finds nothing but what the hostile owner did and what is allowed.
@@ -35,11 +32,6 @@ private:
     void end();
     void kill();
     void boot();
-    /// A home that is missing at a boot and comes later: nothing in it may be taken for gone.
-    void bootWithoutAHome();
-    /// Makes what must not be lost. False: no daemon answered.
-    bool hold();
-    [[nodiscard]] std::optional<zorvane::Client> client() const;
     void lock(bool locked);
     void fillDisk();
     void starve();
@@ -50,9 +42,6 @@ private:
     Session& session_;
     Choices choices_;
     const bool diskCanBeFilled_;
-    const std::string home_;
-    std::string container_;
-    std::string group_;
     Count kills_ = 0;
     Count boots_ = 0;
 };

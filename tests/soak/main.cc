@@ -125,7 +125,6 @@ int soak(const Options& options) {
     if (!home.empty() && ::mount("soak-home", home.c_str(), "tmpfs", 0, "mode=0755,uid=501,gid=501,size=64m") == 0)
         std::puts("the first user's home is a file system of its own");
     daemon.start();
-    surroundings.oneOfTwoSpeaks(true);
     HostileOwner hostile(session, options.seed);
     const auto begin = Clock::now();
 

@@ -138,26 +138,5 @@ TEST(Setup, EndsWithOnePass) {
     EXPECT_FALSE(world.exists(applications + "/Junk"));
 }
 
-// Goal: a mapping that leads to nothing, or out of the root, goes with the next launch. Method: links as a stop, or
-// somebody else, leaves them.
-TEST(SandboxMapping, LeadsToTheContainer) {
-    World world;
-    const FileURL url = world.url("private/var/mobile");
-    const auto map = [&](ContainerClass containerClass, const FileURL& to) {
-        return world.daemonsClient()._setSandboxContainerMappingForUser(mobile, "odd/name", containerClass, to);
-    };
-    EXPECT_FALSE(map(ContainerClass::dataSystem, url));
-    ASSERT_TRUE(map(application, world.url("private/var/mobile/gone")));
-    ASSERT_TRUE(map(ContainerClass::sharedAppGroup, url));
-    // The home that is there may be no more than the place where the real one is mounted.
-    world.daemonsClient().containerManagerSetup();
-    EXPECT_EQ(world.names("run/zorvane/sandbox/501/1").size(), 1U);
-    world.makeDirectories(mobileContainers, mobile);
-    world.link("/etc", "run/zorvane/sandbox/501/1/outside");
-    world.daemonsClient().containerManagerSetup();
-    EXPECT_TRUE(world.names("run/zorvane/sandbox/501/1").empty());
-    EXPECT_EQ(world.names("run/zorvane/sandbox/501/2").size(), 1U);
-}
-
 } // namespace
 } // namespace zor::test

@@ -70,49 +70,6 @@ TEST(Packbuff, WritesByteForByte) {
     }
 }
 
-// Goal: what cannot be written is refused with its code and changes nothing. Method: a table over one writer.
-TEST(Packbuff, RefusesWhatItCannotWrite) {
-    const std::pair<Write, int> rows[] = {
-        {string(1, "a", lengthMax), packbuffInvalidArgument},
-        {string(1, "abc", 2), packbuffInvalidArgument}, // no NUL there
-        // Over 32 bits with the header, the padding, or what is there.
-        {bytes(1, "", lengthMax - 7), packbuffOutOfRange},
-        {bytes(1, "", lengthMax), packbuffOutOfRange},
-        {bytes(1, "", lengthMax - 15), packbuffOutOfRange},
-    };
-    const PackbuffPointer packbuff(sb_packbuff_new(64));
-    ASSERT_EQ(sb_packbuff_pack_string(packbuff.get(), 1, "first", 5), packbuffSuccess);
-    const std::string before = toHex(contentOf(*packbuff));
-    const std::uint8_t* const cursor = packbuff->item;
-    for (const auto& [write, error] : rows) {
-        EXPECT_EQ(write(packbuff.get()), error);
-        EXPECT_TRUE(toHex(contentOf(*packbuff)) == before && packbuff->item == cursor);
-    }
-    ByteVector memory(64);
-    EXPECT_EQ(sb_packbuff_init_with_buffer(memory.data(), 7, false, packbuffDeallocNone), nullptr);
-    for (const std::size_t size : {std::size_t{0}, std::size_t{lengthMax} + 1})
-        EXPECT_EQ(sb_packbuff_init_with_buffer(memory.data(), size, true, packbuffDeallocNone), nullptr);
-}
-
-// Goal: a size that was set to anything makes no later write leave the buffer. Method: every size over a buffer that
-// ends where the memory does, and writes until one is refused.
-TEST(Packbuff, AnySizeThatIsSetStaysInside) {
-    const EdgeOfMemory memory(ByteVector(64));
-    for (std::uint32_t size = 0; size < 80; ++size) {
-        const PackbuffPointer packbuff(sb_packbuff_init_with_buffer(memory.data(), 64, false, packbuffDeallocNone));
-        ASSERT_EQ(sb_packbuff_pack_string(packbuff.get(), 1, "0123456789", 10), packbuffSuccess);
-        sb_packbuff_set_size(packbuff.get(), size);
-        EXPECT_EQ(sb_packbuff_get_size(packbuff.get()), std::min(size, 64U));
-        EXPECT_EQ(packbuff->bytes_remaining, 64U - std::min(size, 64U));
-        int written = 0;
-        while (sb_packbuff_pack_uint32(packbuff.get(), 1, 1) == packbuffSuccess)
-            ASSERT_LT(++written, 10);
-        const PackbuffPointer growing(sb_packbuff_new(16));
-        sb_packbuff_set_size(growing.get(), size);
-        (void)sb_packbuff_pack_string(growing.get(), 1, "0123456789", 10);
-    }
-}
-
 /// The items in order, each read as what it is, and how it ends.
 std::string readAll(sb_packbuff* packbuff) {
     std::string text;

@@ -335,30 +335,6 @@ TEST(Tool, MistakesAreAnswered) {
     ::kill(daemon.pid(), SIGCONT);
 }
 
-// Goal: on a terminal long results are paged, and a table stays within its width but for what is one word; elsewhere
-// the same text is as wide as it needs. Method: a terminal of 50 columns and a pager that marks its lines.
-TEST(Tool, FitsTheTerminal) {
-    DaemonProcess daemon;
-    daemon.start();
-    for (const char* name : {"org.example.short", "org.example.\346\227\245\346\234\254"})
-        expectCall(daemon, {{"create", name, "--class", "2"}, 0, "created"});
-    const auto shown = [&](const std::string& before, const std::string& command) {
-        return runProgram({"/usr/bin/script", "-qec",
-                           "stty cols 50; export TERM=xterm; " + before + " " + programPath("zorvanectl") + " --root " +
-                               daemon.root() + " " + command,
-                           "/dev/null"});
-    };
-    const auto paged = shown("NO_COLOR=1 PAGER='sed s/^/:/'", "list --class 2");
-    EXPECT_EQ(paged.exitStatus, 0);
-    EXPECT_NE(paged.output.find(":    org.example.short"), std::string::npos) << paged.output;
-    std::istringstream lines(paged.output);
-    for (std::string line; std::getline(lines, line);)
-        EXPECT_TRUE(line.starts_with(":") && line.size() < 54) << line;
-    EXPECT_NE(shown("NO_COLOR= PAGER=true", "--no-pager status").output.find("free disk"), std::string::npos);
-    EXPECT_EQ(shown("PAGER='true;'", "status").exitStatus, 0); // left at once
-    EXPECT_NE(daemon.tool({"list", "--class", "2"}).output.find("  org.example.short\n"), std::string::npos);
-}
-
 /// The words that a shell may put after these.
 std::vector<std::string> completed(const DaemonProcess& daemon, std::vector<std::string> words, const char* typed) {
     words.insert(words.begin(), {programPath("zorvanectl"), "__complete", "--root", daemon.root()});

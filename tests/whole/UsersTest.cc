@@ -5,11 +5,10 @@
 #include "os/SystemRoot.h"
 #include "process/DaemonProcess.h"
 #include "support/FileTree.h"
-#include "whole/Expect.h"
 
-#include <algorithm>
 #include <csignal>
 #include <filesystem>
+#include <gtest/gtest.h>
 #include <unistd.h>
 
 namespace zor::whole {
@@ -26,30 +25,6 @@ std::string pathIn(const Outcome& outcome, const std::string& root) {
     return begin == std::string::npos
                ? ""
                : outcome.output.substr(begin, outcome.output.find_first_of("\"\n ", begin) - begin);
-}
-
-// Goal: a daemon that cannot serve a root says so in one line that helps. Method: roots that lack something, or whose
-// configuration cannot be meant.
-TEST(Users, OneLineSaysWhyTheDaemonDoesNotStart) {
-    const struct {
-        const char* configuration;
-        const char* said;
-    } rows[] = {
-        {nullptr, "make what it has to hold: zorvanectl init --root "},
-        {"[users]\nfirst=505\nlast=500\n", "zorvaned.conf: first=505 to last=500 holds no user"},
-        {"[users]\ninstaller=502\n", "zorvaned.conf: line 2: installer=502: this number belongs to the account second"},
-    };
-    for (const auto& row : rows) {
-        const DaemonProcess place;
-        if (row.configuration)
-            writeFile(place.path("etc/zorvane/zorvaned.conf"), row.configuration);
-        else
-            std::filesystem::remove_all(place.path("private/var/brevad"));
-        const auto outcome = runProgram({programPath("zorvaned"), "--root", place.root()});
-        expectOutcome(outcome, 1, row.said);
-        EXPECT_EQ(std::ranges::count(outcome.output, '\n'), 1) << outcome.output;
-        EXPECT_NE(place.tool({"check"}).exitStatus, 0) << row.said;
-    }
 }
 
 // Goal: init makes a root that works, and a second one changes nothing. Method: the next command is create.
