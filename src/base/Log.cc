@@ -3,6 +3,9 @@
 
 #include "plist/Text.h"
 
+#include <utility>
+#include <vector>
+
 namespace zor {
 
 namespace {
@@ -15,6 +18,17 @@ const LogSubject& LogSubject::current() {
     return subject;
 }
 
+LogSubject::Describe LogSubject::keptRequest() {
+    if (!subject.request)
+        return {};
+    std::vector<std::pair<std::string, std::string>> fields;
+    (*subject.request)([&](std::string_view name, std::string_view value) { fields.emplace_back(name, value); });
+    return [fields = std::move(fields)](const Take& take) {
+        for (const auto& [name, value] : fields)
+            take(name, value);
+    };
+}
+
 LogCodeScope::LogCodeScope(ErrorCode code) {
     subject.code = code;
 }
@@ -23,8 +37,8 @@ LogCodeScope::~LogCodeScope() {
     subject.code.reset();
 }
 
-LogRequestScope::LogRequestScope(const std::function<void(const LogSubject::Take&)>& describe) {
-    subject.request = &describe;
+LogRequestScope::LogRequestScope(const LogSubject::Describe& describe) {
+    subject.request = describe ? &describe : nullptr;
 }
 
 LogRequestScope::~LogRequestScope() {

@@ -29,10 +29,13 @@ struct LogSubject {
     std::optional<ErrorCode> code = {};
     /// Fields of the request; empty outside of one.
     using Take = std::function<void(std::string_view name, std::string_view value)>;
-    const std::function<void(const Take&)>* request = nullptr;
+    using Describe = std::function<void(const Take&)>;
+    const Describe* request = nullptr;
 
     /// The subject of this thread, now.
     [[nodiscard]] static const LogSubject& current();
+    /// A copy of the request's fields, for work that goes on after the request. Empty outside of one.
+    [[nodiscard]] static Describe keptRequest();
 };
 
 /// While open, lines of this thread are about an error of this code.
@@ -44,10 +47,10 @@ public:
     LogCodeScope& operator=(const LogCodeScope&) = delete;
 };
 
-/// While open, lines of this thread belong to a request, which outlives this.
+/// While open, lines of this thread belong to a request, which outlives this; to none when `describe` is empty.
 class LogRequestScope {
 public:
-    explicit LogRequestScope(const std::function<void(const LogSubject::Take&)>& describe);
+    explicit LogRequestScope(const LogSubject::Describe& describe);
     ~LogRequestScope();
     LogRequestScope(const LogRequestScope&) = delete;
     LogRequestScope& operator=(const LogRequestScope&) = delete;

@@ -81,7 +81,7 @@ void Dispatcher::ZORProcessIpsiEvent(platform::PeerConnection& connection, platf
     if (event.kind == platform::ServiceEvent::Kind::invalid)
         return;
     const Log::ClientScope provoked(connection.peer().kernelUserId());
-    const std::function<void(const LogSubject::Take&)> describe = [&](const LogSubject::Take& take) {
+    const LogSubject::Describe describe = [&](const LogSubject::Take& take) {
         describeRequest(connection.peer(), event, take);
     };
     const LogRequestScope asked(describe);

@@ -52,6 +52,7 @@ void ZORDataProtectionChangeOperation::performChangeOperation() {
 }
 
 void ZORDataProtectionChangeOperation::retry() {
+    const LogRequestScope asked(request_);
     conclude(needs_.boundary.run({performFunction, __LINE__}, [&] {
         startRetry();
         return attempt();
@@ -105,6 +106,8 @@ void ZORDataProtectionChangeOperation::queueRetry() {
         "Retrying container protection update to %d on next unlock for user: %u, id: %s, containerClass: %llu",
         newDataProtectionClass_, container.uid(), ZOR_SHOWN(container.identifier()),
         number(container.containerClass()));
+    if (!request_)
+        request_ = LogSubject::keptRequest();
     ZORDispatchAsyncWithTransaction(needs_.retries, [self = shared_from_this()] { self->retry(); });
 }
 

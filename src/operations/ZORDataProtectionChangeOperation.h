@@ -119,6 +119,8 @@ private:
     const RetryIfLocked retryIfLocked_;
     const std::int32_t operationType_;
     bool retried_ = false;
+    /// The request that asked for the change, for the log lines of retries; kept when it begins to wait.
+    LogSubject::Describe request_;
     std::function<void()> retryStartBlock_;
     std::function<void(const IdentifierWriteLock&)> recordBlock_;
     CompletionBlock completionBlock_;

@@ -143,20 +143,25 @@ TEST_F(Protection, WhatIsSet) {
     EXPECT_EQ(classOf(path + "Documents"), 257); // and none is cut to fewer bits
 }
 
-// Goal: a locked device answers 61, or is waited for under an assertion, through a second lock too.
-// Method: lock, ask, unlock by hand.
+// Goal: a locked device answers 61, or is waited for under an assertion, through a second lock too; what is said
+// meanwhile belongs to the request. Method: lock, ask, unlock by hand.
 TEST_F(Protection, WaitsForTheUnlock) {
     put("Documents/file", 4);
     lock();
     EXPECT_EQ(change(to(1)), 61U);
     EXPECT_FALSE(recorded());
     Answers answers;
-    ask(to(1, true), answers);
+    {
+        const LogSubject::Describe request = [](const LogSubject::Take& take) { take("ZORVANE_REQUEST", "7"); };
+        const LogRequestScope asked(request);
+        ask(to(1, true), answers);
+    }
     EXPECT_TRUE(answers.codes().empty());
     ASSERT_EQ(manager().pending().size(), 1U);
     EXPECT_EQ(manager().pending()[0].dataProtectionClass, 1);
     EXPECT_FALSE(world.exists(assertionFile));
     EXPECT_EQ(world.services().platform().transactions.count(), 1U);
+    EXPECT_EQ(world.log.request(), "ZORVANE_REQUEST=7 ");
     // Unlocked and at once locked again: the queue runs and finds the device locked.
     world.linux().roles().lockStateQueue.resume();
     for (int i = 0; i < 2000 && !world.exists(assertionFile); ++i)
@@ -170,6 +175,7 @@ TEST_F(Protection, WaitsForTheUnlock) {
     world.lockState.state = 0;
     suspended = false;
     EXPECT_EQ(answers.codes(patience), std::vector<std::uint64_t>{1});
+    EXPECT_EQ(world.log.request(), "ZORVANE_REQUEST=7 ");
     EXPECT_FALSE(world.exists(assertionFile));
     EXPECT_EQ(::flock(held.get(), LOCK_SH | LOCK_NB), 0);
     EXPECT_EQ(classOf(path + "Documents/file"), 1);

@@ -66,10 +66,10 @@ public:
         return messages;
     }
 
-    /// The fields that a line told last of the request that it belongs to: "NAME=VALUE " for each.
+    /// The fields that a line since the last call told of the request that it belongs to: "NAME=VALUE " for each.
     std::string request() {
         const platform::MutexLock held(mutex_);
-        return request_;
+        return std::exchange(request_, {});
     }
 
 private:
