@@ -112,9 +112,9 @@ Result<void> Deletion::stageForDelete(const DeletionBatch& batch, Progress& prog
         return {};
     // The purpose of a transient one may not come to be: what is registered is still the live one's.
     if (isBundleClass(containerClass) && !record->transient() && progress.released != index) {
+        TRY(needs_.entitlementChange.removeEntitlementDictionariesForIdentifierAndItsChildren(
+            *identifier, progress.unsettled, lock));
         progress.released = index;
-        progress.unsettled =
-            needs_.entitlementChange.removeEntitlementDictionariesForIdentifierAndItsChildren(*identifier, lock);
         if (progress.unsettled)
             return {};
     }

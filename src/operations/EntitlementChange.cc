@@ -59,11 +59,11 @@ ErrorCode EntitlementChange::processEntitlements(const plist::Dictionary* entitl
             return ErrorCode::success;
         prepare(*identifier);
         std::optional<Change> change;
-        const ErrorCode code = [&] {
+        TRY(needs_.removal.undisturbed([&] {
             const AllIdentifiersWriteLock lock(needs_.locks);
             return process(entitlements, *identifier, options, change, lock);
-        }();
-        return change ? settle(*change) : code;
+        }));
+        return change ? settle(*change) : ErrorCode::success;
     });
     return processed ? *processed : processed.error().replyCode();
 }
@@ -97,16 +97,17 @@ ErrorCode EntitlementChange::settle(Change change) {
     return settled ? ErrorCode::success : settled.error().replyCode();
 }
 
-std::optional<EntitlementChange::Change>
-EntitlementChange::removeEntitlementDictionariesForIdentifierAndItsChildren(const std::string& identifier,
-                                                                            const AllIdentifiersWriteLock& lock) {
-    std::optional<Change> last;
+Result<void> EntitlementChange::removeEntitlementDictionariesForIdentifierAndItsChildren(
+    const std::string& identifier, std::optional<Change>& change, const AllIdentifiersWriteLock& lock) {
     for (const std::string& one : withChildren(identifier)) {
-        std::optional<Change> change;
-        sayIfNotCleared(one, process(nullptr, one, nullptr, change, lock));
-        last = std::max(last, change);
+        std::optional<Change> its;
+        auto processed = process(nullptr, one, nullptr, its, lock);
+        change = std::max(change, its);
+        if (!processed && ReplaceRecovery::metOneUnderWay(processed.error()))
+            return processed;
+        sayIfNotCleared(one, processed ? ErrorCode::success : processed.error().replyCode());
     }
-    return last;
+    return {};
 }
 
 void EntitlementChange::settleRemoval(const std::string& identifier, Change change) {
@@ -120,25 +121,21 @@ void EntitlementChange::sayIfNotCleared(const std::string& identifier, ErrorCode
                          static_cast<unsigned long long>(code));
 }
 
-ErrorCode EntitlementChange::process(const plist::Dictionary* entitlements, const std::string& identifier,
-                                     const plist::Dictionary* options, std::optional<Change>& change,
-                                     const AllIdentifiersWriteLock& lock) {
+Result<void> EntitlementChange::process(const plist::Dictionary* entitlements, const std::string& identifier,
+                                        const plist::Dictionary* options, std::optional<Change>& change,
+                                        const AllIdentifiersWriteLock& lock) {
     try {
         if (!canBeProcessed(identifier, options))
             return makeError(needs_.log, {processFunction, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
                              "Can't act on an invalid object: ID: %s, parent ID: %s", ZOR_SHOWN(identifier),
-                             plist::describe(parentIn(options)).c_str())
-                .replyCode();
+                             plist::describe(parentIn(options)).c_str());
         if (const char* why = whyGroupsAreUnusable(entitlements))
             return makeError(needs_.log, {processFunction, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                             "Can't act on an invalid object: ID: %s: %s", ZOR_SHOWN(identifier), why)
-                .replyCode();
-        const auto applied = planReleaseApply(entitlements, identifier, options, lock);
-        if (applied)
-            change = *applied;
-        return applied ? ErrorCode::success : applied.error().replyCode();
+                             "Can't act on an invalid object: ID: %s: %s", ZOR_SHOWN(identifier), why);
+        change = TRY(planReleaseApply(entitlements, identifier, options, lock));
+        return {};
     } catch (const std::exception& exception) {
-        return needs_.boundary.caught({processFunction, __LINE__}, exception).replyCode();
+        return needs_.boundary.caught({processFunction, __LINE__}, exception);
     }
 }
 
@@ -147,26 +144,32 @@ EntitlementChange::planReleaseApply(const plist::Dictionary* entitlements, const
                                     const plist::Dictionary* options, const AllIdentifiersWriteLock& lock) {
     const ZOREntitlementMapping::Plan plan = needs_.entitlements.plan(entitlements, identifier, options, lock);
     std::vector<FileURL> changed;
-    if (plan.releasesSystemContainer)
-        releaseSystemContainer(identifier, changed, lock);
-    for (const auto& [type, before, after] : plan.groups)
-        if (before)
-            needs_.groups.handleChangeFromOldGroupContainerIds(before, after, type, identifier, changed, lock);
+    const auto released = [&]() -> Result<void> {
+        if (plan.releasesSystemContainer)
+            TRY(releaseSystemContainer(identifier, changed, lock));
+        for (const auto& [type, before, after] : plan.groups)
+            if (before)
+                TRY(needs_.groups.handleChangeFromOldGroupContainerIds(before, after, type, identifier, changed, lock));
+        return {};
+    }();
     {
         const platform::MutexLock held(unsyncedMutex_);
         std::ranges::move(changed, std::back_inserter(unsynced_));
     }
+    TRY(released);
     return needs_.entitlements.apply(plan, lock);
 }
 
-void EntitlementChange::releaseSystemContainer(const std::string& identifier, std::vector<FileURL>& changed,
-                                               const AllIdentifiersWriteLock& lock) {
+Result<void> EntitlementChange::releaseSystemContainer(const std::string& identifier, std::vector<FileURL>& changed,
+                                                       const AllIdentifiersWriteLock& lock) {
     const std::uint32_t user = needs_.configuration.users().system;
+    // Between its moves a replace has no live container.
+    TRY(needs_.removal.refuseIfUnderWay(user, ContainerClass::dataSystem, identifier));
     const auto record = needs_.cache.containerForUser(user, ContainerClass::dataSystem, &identifier, false);
     if (!record) {
         needs_.log.write(logLevelError, processFunction, "Failed to retrieve system container %s: %s",
                          ZOR_SHOWN(identifier), record.error().text().c_str());
-        return;
+        return {};
     }
     needs_.log.write(logLevelError, processFunction,
                      "Deleting system container for ID: %s because it is no longer in the entitlements",
@@ -179,6 +182,7 @@ void EntitlementChange::releaseSystemContainer(const std::string& identifier, st
     if (!staged)
         needs_.log.write(logLevelError, processFunction, "Failed to destroy system container with identifier %s: %llu",
                          ZOR_SHOWN(identifier), static_cast<unsigned long long>(staged.error().replyCode()));
+    return {};
 }
 
 } // namespace zor

@@ -9,7 +9,10 @@
 // row that the old map still speaks of: asked for again, they are made anew.
 //
 // A change that another thread settles is settled with the moves that belong to it: a change leaves its moves here
-// before it is applied, and who settles takes all that were left before it syncs. Any thread.
+// before it is applied, and who settles takes all that were left before it syncs.
+//
+// A container that is to be released while its replace waits for the disk is waited for, without the lock; then the
+// change is planned anew. Any thread.
 #pragma once
 
 #include "base/FileURL.h"
@@ -48,10 +51,12 @@ public:
     using Change = ZOREntitlementMapping::Change;
     /// Reads what the removal will have to know of containers, before the lock is taken.
     void prepareRemoval(const std::string& identifier);
-    /// Removes what is stored for an identifier and for the children recorded for it. The change that is to be settled
-    /// when the lock is released (settleRemoval); nullopt for none. Failures are logged.
-    std::optional<Change> removeEntitlementDictionariesForIdentifierAndItsChildren(const std::string& identifier,
-                                                                                   const AllIdentifiersWriteLock& lock);
+    /// Removes what is stored for an identifier and for the children recorded for it. `change` gets the last change
+    /// that is to be settled when the lock is released (settleRemoval), if it is later. Failures are logged; an error
+    /// only where ReplaceRecovery::metOneUnderWay: a part may have been done, and the rest is done when called again.
+    Result<void> removeEntitlementDictionariesForIdentifierAndItsChildren(const std::string& identifier,
+                                                                          std::optional<Change>& change,
+                                                                          const AllIdentifiersWriteLock& lock);
     /// Returns when that, and what it released, is on the disk. Without a lock. Failures are logged.
     void settleRemoval(const std::string& identifier, Change change);
 
@@ -62,15 +67,16 @@ private:
     void prepare(const std::string& identifier);
     std::vector<std::string> withChildren(const std::string& identifier) const;
     void sayIfNotCleared(const std::string& identifier, ErrorCode code) const;
-    /// `change` gets what is to be settled, if anything is.
-    ErrorCode process(const plist::Dictionary* entitlements, const std::string& identifier,
-                      const plist::Dictionary* options, std::optional<Change>& change,
-                      const AllIdentifiersWriteLock& lock);
+    /// `change` gets what is to be settled, if anything is. An error of ReplaceRecovery::metOneUnderWay comes before
+    /// the map is changed; containers may have gone that the map still speaks of.
+    Result<void> process(const plist::Dictionary* entitlements, const std::string& identifier,
+                         const plist::Dictionary* options, std::optional<Change>& change,
+                         const AllIdentifiersWriteLock& lock);
     Result<std::optional<Change>> planReleaseApply(const plist::Dictionary* entitlements, const std::string& identifier,
                                                    const plist::Dictionary* options,
                                                    const AllIdentifiersWriteLock& lock);
-    void releaseSystemContainer(const std::string& identifier, std::vector<FileURL>& changed,
-                                const AllIdentifiersWriteLock& lock);
+    Result<void> releaseSystemContainer(const std::string& identifier, std::vector<FileURL>& changed,
+                                        const AllIdentifiersWriteLock& lock);
 
     const Needs needs_;
     platform::Mutex unsyncedMutex_;

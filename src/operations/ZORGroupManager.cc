@@ -58,59 +58,67 @@ void ZORGroupManager::prepare(const std::string& identifier) {
             forEachUser(type, [&](std::uint32_t userId) { needs_.cache.prepare(userId, classOf(type), false); });
 }
 
-void ZORGroupManager::handleChangeFromOldGroupContainerIds(Identifiers oldGroups, const Identifiers& newGroups,
-                                                           GroupType type, const std::string& identifier,
-                                                           std::vector<FileURL>& changed,
-                                                           const AllIdentifiersWriteLock& lock) {
+Result<void> ZORGroupManager::handleChangeFromOldGroupContainerIds(Identifiers oldGroups, const Identifiers& newGroups,
+                                                                   GroupType type, const std::string& identifier,
+                                                                   std::vector<FileURL>& changed,
+                                                                   const AllIdentifiersWriteLock& lock) {
     if (!oldGroups || oldGroups == newGroups)
-        return;
+        return {};
     if (newGroups)
         std::erase_if(*oldGroups, [&](const std::string& group) {
             return std::ranges::find(*newGroups, group) != newGroups->end();
         });
-    _removeReferenceForGroupIdentifiers(*oldGroups, type, identifier, changed, lock);
+    return _removeReferenceForGroupIdentifiers(*oldGroups, type, identifier, changed, lock);
 }
 
-void ZORGroupManager::_removeReferenceForGroupIdentifiers(const std::vector<std::string>& groups, GroupType type,
-                                                          const std::string& identifier, std::vector<FileURL>& changed,
-                                                          const AllIdentifiersWriteLock& lock) {
+Result<void> ZORGroupManager::_removeReferenceForGroupIdentifiers(const std::vector<std::string>& groups,
+                                                                  GroupType type, const std::string& identifier,
+                                                                  std::vector<FileURL>& changed,
+                                                                  const AllIdentifiersWriteLock& lock) {
     if (groups.empty())
-        return;
+        return {};
     const auto references = _copyReferenceCountSetOfType(type);
     if (!references) {
         needs_.log.write(logLevelError, __func__, "Failed to get reference count information for group type: %ld",
                          static_cast<long>(type));
-        return;
+        return {};
     }
+    Result<void> met;
     forEachUser(type, [&](std::uint32_t userId) {
         for (const std::string& group : groups)
-            _removeGroupContainersIfNeededforUser(userId, classOf(type), group, identifier, *references, changed, lock);
+            if (auto removed = _removeGroupContainersIfNeededforUser(userId, classOf(type), group, identifier,
+                                                                     *references, changed, lock);
+                !removed)
+                met = std::move(removed);
     });
+    return met;
 }
 
-void ZORGroupManager::_removeGroupContainersIfNeededforUser(std::uint32_t userId, ContainerClass containerClass,
-                                                            const std::string& group, const std::string& identifier,
-                                                            const References& references, std::vector<FileURL>& changed,
-                                                            const AllIdentifiersWriteLock& lock) {
+Result<void> ZORGroupManager::_removeGroupContainersIfNeededforUser(
+    std::uint32_t userId, ContainerClass containerClass, const std::string& group, const std::string& identifier,
+    const References& references, std::vector<FileURL>& changed, const AllIdentifiersWriteLock& lock) {
     const auto holders = references.find(group);
     const std::size_t count = holders == references.end() ? 0 : holders->second.size();
     // One reference that is somebody else's is not the one that goes.
     if (count != 1 || holders->second.front() != identifier) {
         ZOR_LOG(needs_.log, logLevelDebug, "Reference count for user: %u, ID: %s is %ld", userId, ZOR_SHOWN(group),
                 static_cast<long>(count));
-        return;
+        return {};
     }
+    // Between its moves a replace has no live container.
+    TRY(needs_.recovery.refuseIfUnderWay(userId, containerClass, group));
     const auto record = needs_.cache.containerForUser(userId, containerClass, &group, false);
     if (!record) {
         ZOR_LOG(needs_.log, logLevelDebug,
                 "Failed to retrieve group container %s for %u : %s.  May not exist for this user", ZOR_SHOWN(group),
                 userId, record.error().text().c_str());
-        return;
+        return {};
     }
     needs_.log.write(logLevelNotice, __func__,
                      "Last reference to group container %s for %u is going away; removing it.", ZOR_SHOWN(group),
                      userId);
     (void)isStaged(__func__, userId, **record, needs_.removal.stage(toGo(userId, **record), changed, lock));
+    return {};
 }
 
 bool ZORGroupManager::isStaged(const char* function, std::uint32_t userId, const ZORMetadata& record,

@@ -58,23 +58,25 @@ public:
     /// For who is about to change the entitlements of an identifier, without a lock: has read what the next needs.
     void prepare(const std::string& identifier);
     /// Stages the containers of groups that lose their last reference by a change of `identifier` that has not been
-    /// applied: the map still holds what was before. `changed` as ContainerRemoval::stage has it.
-    void handleChangeFromOldGroupContainerIds(Identifiers oldGroups, const Identifiers& newGroups, GroupType type,
-                                              const std::string& identifier, std::vector<FileURL>& changed,
-                                              const AllIdentifiersWriteLock& lock);
+    /// applied: the map still holds what was before. `changed` as ContainerRemoval::stage has it. One that cannot be
+    /// staged is logged and stays for the next boot; an error only where ReplaceRecovery::metOneUnderWay.
+    Result<void> handleChangeFromOldGroupContainerIds(Identifiers oldGroups, const Identifiers& newGroups,
+                                                      GroupType type, const std::string& identifier,
+                                                      std::vector<FileURL>& changed,
+                                                      const AllIdentifiersWriteLock& lock);
     /// Stages every group container that the map does not refer to. At the boot, before clients are served.
     std::uint64_t reconcileGroupContainersOfType(GroupType type);
 
 private:
     /// nullopt, logged, when the map is known to be incomplete.
     [[nodiscard]] std::optional<References> _copyReferenceCountSetOfType(GroupType type);
-    void _removeReferenceForGroupIdentifiers(const std::vector<std::string>& groups, GroupType type,
-                                             const std::string& identifier, std::vector<FileURL>& changed,
-                                             const AllIdentifiersWriteLock& lock);
-    void _removeGroupContainersIfNeededforUser(std::uint32_t userId, ContainerClass containerClass,
-                                               const std::string& group, const std::string& identifier,
-                                               const References& references, std::vector<FileURL>& changed,
-                                               const AllIdentifiersWriteLock& lock);
+    Result<void> _removeReferenceForGroupIdentifiers(const std::vector<std::string>& groups, GroupType type,
+                                                     const std::string& identifier, std::vector<FileURL>& changed,
+                                                     const AllIdentifiersWriteLock& lock);
+    Result<void> _removeGroupContainersIfNeededforUser(std::uint32_t userId, ContainerClass containerClass,
+                                                       const std::string& group, const std::string& identifier,
+                                                       const References& references, std::vector<FileURL>& changed,
+                                                       const AllIdentifiersWriteLock& lock);
     std::uint64_t _cleanupUnreferencedGroupContainersForUser(std::uint32_t userId, ContainerClass containerClass,
                                                              const References& references);
     /// Says it where a container could not be staged; whether it was.

@@ -195,8 +195,10 @@ TEST_F(Processing, TheMapAfterEachCall) {
     ASSERT_TRUE(
         mapping()._setEntitlementDictionaryValues({Dictionary{{"a", Array{"b", placeholder, 5, "c"}}}}, {children}));
     ASSERT_EQ(process(e, "kept", caller), success);
+    std::optional<EntitlementChange::Change> change;
     EXPECT_TRUE(world.services().store().entitlementChange.removeEntitlementDictionariesForIdentifierAndItsChildren(
-        "a", AllIdentifiersWriteLock(world.services().locks())));
+        "a", change, AllIdentifiersWriteLock(world.services().locks())));
+    EXPECT_TRUE(change);
     EXPECT_EQ(mapping().entitlementMappingDict(), (Dictionary{{"kept", e}, {byCaller, Dictionary{{"kept", true}}}}));
 }
 

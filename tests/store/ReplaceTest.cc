@@ -402,41 +402,58 @@ TEST(ReplaceAnywhere, NothingWaitsUnderTheLock) {
         }
 }
 
-// Goal: whoever has to do with a container whose replace waits for the disk waits for that one, and nobody else does.
-// Method: on a file system without order, the sync between the two moves is held up; requests meanwhile.
+// Goal: a request that has to do with a container whose replace waits for the disk waits for that one, and nobody else
+// does; a group or bundle that is released meanwhile goes afterwards. Method: on a file system without order, the sync
+// between the two moves is held up; requests meanwhile.
 TEST_F(ReplaceWithoutOrder, OnlyWhoHasToDoWithItWaits) {
-    const FoundContainer old = make("id", false);
-    const FoundContainer fresh = make("id", asTransient);
-    std::promise<void> reached;
-    std::promise<void> goOn;
-    std::atomic<int> step = 0;
-    world.disk().before = [&, held = goOn.get_future().share()](const DiskCallInfo& call) {
-        if (call.call == DiskCall::rename && call.subject.starts_with(nameOf(old.path) + " -> "))
-            step = 1;
-        else if (int one = 1; isSync(call) && step.compare_exchange_strong(one, 2)) {
-            reached.set_value();
-            held.wait();
-        }
+    constexpr ContainerClass group = ContainerClass::sharedAppGroup;
+    world.write(groupMarkerPath, ""); // without it nothing goes for want of a reference
+    using Requests = std::vector<std::function<ErrorCode(const FoundContainer& fresh, const FoundContainer& holder)>>;
+    const Requests rounds[] = {
+        {[&](auto&, auto&) { return codeOf(world.create("id", group)); },
+         [&](auto& fresh, auto&) { return world.stage(fresh); },
+         [&](auto& fresh, auto&) {
+             return codeOf(world.daemonsClient().regenerateDirectoryUUIDForUser(addressOf(fresh)));
+         }},
+        {[&](auto&, auto&) { return world.entitle("holder", std::nullopt); }},
+        {[&](auto&, auto& holder) { return world.stage(holder); }},
     };
-    auto replaced = std::async(std::launch::async, [&] { return world.replace(&old, fresh); });
-    reached.get_future().wait();
-    std::future<ErrorCode> requests[] = {
-        std::async(std::launch::async, [&] { return codeOf(world.create("id")); }),
-        std::async(std::launch::async, [&] { return world.stage(fresh); }),
-        std::async(std::launch::async,
-                   [&] { return codeOf(world.daemonsClient().regenerateDirectoryUUIDForUser(addressOf(fresh))); }),
-    };
-    EXPECT_TRUE(world.create("another"));
-    for (auto& one : requests)
-        EXPECT_EQ(one.wait_for(std::chrono::milliseconds(50)), std::future_status::timeout);
-    goOn.set_value();
-    EXPECT_EQ(complaintOf(replaced.get()), "");
-    for (auto& one : requests)
-        EXPECT_TRUE(one.get() == ErrorCode::success || &one == &requests[2]); // renamed, or deleted before
-    world.disk().before = nullptr;
-    world.relaunch();
-    EXPECT_TRUE(isQuiet());
-    EXPECT_EQ(world.names(applications).size(), std::size_t{1} + (world.find("id") ? 1 : 0));
+    for (const Requests& round : rounds) {
+        SCOPED_TRACE(&round - rounds);
+        ASSERT_EQ(world.entitle("holder", plist::Dictionary{{std::string(entitlementKeys::applicationGroups),
+                                                             plist::Array{"id"}}}),
+                  ErrorCode::success);
+        const FoundContainer holder = make("holder", false, bundle);
+        const FoundContainer old = make("id", false, group);
+        const FoundContainer fresh = make("id", asTransient, group);
+        std::promise<void> reached;
+        std::promise<void> goOn;
+        std::atomic<int> step = 0;
+        world.disk().before = [&, held = goOn.get_future().share()](const DiskCallInfo& call) {
+            if (call.call == DiskCall::rename && call.subject.starts_with(nameOf(old.path) + " -> "))
+                step = 1;
+            else if (int one = 1; isSync(call) && step.compare_exchange_strong(one, 2)) {
+                reached.set_value();
+                held.wait();
+            }
+        };
+        auto replaced = std::async(std::launch::async, [&] { return world.replace(&old, fresh); });
+        reached.get_future().wait();
+        std::vector<std::future<ErrorCode>> requests;
+        for (const auto& request : round)
+            requests.push_back(std::async(std::launch::async, [&] { return request(fresh, holder); }));
+        EXPECT_TRUE(world.create("another"));
+        for (auto& one : requests)
+            EXPECT_EQ(one.wait_for(std::chrono::milliseconds(50)), std::future_status::timeout);
+        goOn.set_value();
+        EXPECT_EQ(complaintOf(replaced.get()), "");
+        for (auto& one : requests)
+            EXPECT_TRUE(one.get() == ErrorCode::success || &one - requests.data() == 2); // renamed, or deleted before
+        world.disk().before = nullptr;
+        EXPECT_TRUE(round.size() > 1 || !world.find("id", group));
+        world.relaunch();
+        EXPECT_TRUE(isQuiet());
+    }
 }
 
 // Goal: a wipe keeps path and UUID and leaves a new one's content. Method: a table of clients and classes, a restart.
