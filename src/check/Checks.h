@@ -4,6 +4,7 @@
 
 #include "check/Look.h"
 #include "check/StoreCheck.h"
+#include "fs/FileSystemDeathRow.h"
 #include "store/StorePlaces.h"
 #include "store/ZORMetadata.h"
 
@@ -87,6 +88,8 @@ private:
 // The daemon's own directories: what a stop left in them, what waits on death rows, the sandbox mappings and the boot
 // marker. Reads alone; one thread.
 
+/// Calls with the topmost directory of each file system that may have a death row of its own, once.
+void forEachTop(Look& look, const std::function<void(const fs::MountTop& top)>& function);
 /// Calls with each row that there is, open for reading, and what it is called.
 void forEachDeathRow(Look& look, const std::function<void(int row, const FileURL& url)>& function);
 
@@ -106,6 +109,7 @@ public:
 
 private:
     void checkStaging();
+    void checkAside();
     void checkDeathRow();
     void addDeathRowItems(int directory, const FileURL& row);
     void checkJournals();

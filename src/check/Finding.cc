@@ -77,6 +77,13 @@ constexpr std::array<FindingPage, findingCodeCount> pages = {{
     {FindingCode::stagingLeftover, "staging-leftover", fault, "something lies in the staging directory",
      "the daemon was stopped while it made or replaced a container; or it is at work on something large right now",
      "it takes its space", "nothing: the next start of the daemon finishes or discards it"},
+    {FindingCode::asideLeftover, "aside-leftover", fault,
+     "an old container lies aside at the top of its file system, or a copy that was to take its place",
+     "the daemon was stopped in the middle of a replace; or it is at one right now",
+     "it takes its space; no client can see it",
+     "nothing: the next start of the daemon brings it back or discards it. If it stays, the journal beside it cannot "
+     "be "
+     "settled: see journal-leftover"},
     {FindingCode::deathRowItem, "death-row-item", fault, "something waits for its deletion",
      "the daemon was stopped before it came to it, or something in it cannot be removed",
      "it takes its space; no client can see it", "zorvanectl empty-death-row deletes it; so does the next start"},

@@ -31,6 +31,7 @@ enum class FindingCode : std::uint8_t {
     infoUnsaved,
     mappingDangling,
     stagingLeftover,
+    asideLeftover,
     deathRowItem,
     journalLeftover,
     writeLeftover,
@@ -47,7 +48,7 @@ enum class FindingCode : std::uint8_t {
     userNumberTaken,
     unexamined,
 };
-inline constexpr std::size_t findingCodeCount = 28;
+inline constexpr std::size_t findingCodeCount = 29;
 
 /// The one who puts it right.
 enum class Mender : std::uint8_t {

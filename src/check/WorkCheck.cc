@@ -5,7 +5,6 @@
 #include "base/Format.h"
 #include "device/LinkSandboxUserState.h"
 #include "fs/AtomicFile.h"
-#include "fs/FileSystemDeathRow.h"
 #include "fs/Names.h"
 #include "fs/Trees.h"
 #include "os/FileDescriptor.h"
@@ -20,22 +19,26 @@
 
 namespace zor::check {
 
-void forEachDeathRow(Look& look, const std::function<void(int row, const FileURL& url)>& function) {
-    const FileURL own = look.device().places().deathrowDirectory();
-    if (const auto directory = look.openDirectory(own))
-        function(directory->get(), own);
-    // That of each other file system.
+void forEachTop(Look& look, const std::function<void(const fs::MountTop& top)>& function) {
     std::vector<FileURL> places = look.device().places().placesOfSharedContainers();
     for (const MobileUser& user : look.users())
         places.push_back(user.home);
     std::set<std::pair<dev_t, ino_t>> seen;
     for (const FileURL& place : places) {
         const auto top = fs::topOfMount(look.device().fileManager().resolver(), place);
-        if (!top || !seen.insert(top->identity).second)
-            continue;
-        if (const auto directory = fs::openDeathRow(top->directory.get()))
-            function(directory->get(), fs::deathRowBelow(top->url));
+        if (top && seen.insert(top->identity).second)
+            function(*top);
     }
+}
+
+void forEachDeathRow(Look& look, const std::function<void(int row, const FileURL& url)>& function) {
+    const FileURL own = look.device().places().deathrowDirectory();
+    if (const auto directory = look.openDirectory(own))
+        function(directory->get(), own);
+    forEachTop(look, [&](const fs::MountTop& top) {
+        if (const auto directory = fs::openDeathRow(top.directory.get()))
+            function(directory->get(), fs::deathRowBelow(top.url));
+    });
 }
 
 DeathRow lookAtDeathRow(CheckedSystem& system) {
@@ -79,6 +82,7 @@ bool isYoung(int directory, const char* name) {
 
 void WorkCheck::checkAll() {
     checkStaging();
+    checkAside();
     checkDeathRow();
     checkJournals();
     checkLibrary();
@@ -98,6 +102,19 @@ void WorkCheck::checkStaging() {
         else
             look_.add(FindingCode::stagingLeftover, staging.appendingDirectory(name),
                       "was being made or replaced when the daemon stopped", Mender::launch);
+    });
+}
+
+void WorkCheck::checkAside() {
+    forEachTop(look_, [this](const fs::MountTop& top) {
+        const auto directory = fs::openAside(top.directory.get());
+        if (!directory)
+            return;
+        const FileURL aside = fs::asideBelow(top.url);
+        look_.forEachName(directory->get(), aside, [&](const char* name) {
+            look_.add(FindingCode::asideLeftover, aside.appendingDirectory(name),
+                      "was out of the way of a replace when the daemon stopped", Mender::launch);
+        });
     });
 }
 
@@ -138,7 +155,8 @@ void WorkCheck::addJournal(const FileURL& url) {
         else if (fileManager.itemExistsAtURL(journal->oldUrl))
             what = "is the journal of a replace that has not begun";
         else if (fileManager.itemExistsAtURL(journal->waitingUrl()))
-            what = "is the journal of a replace that will be undone: its old container waits in staging";
+            what = std::string("is the journal of a replace that will be undone: its old container waits ") +
+                   (journal->asideUrl.empty() ? "in staging" : "aside on its own file system");
         else
             what = "is the journal of a replace of which nothing is left";
     }

@@ -173,6 +173,14 @@ std::vector<Damage> damages() {
          mapping + "org.data"},
         {"half a mapping", [](S s) { s.map(s.data, ".new-0"); }, writeLeftover, launch, mapping + ".new-0"},
         {"staging", [](S s) { s.leave(std::string("Staging/") + uuid); }, stagingLeftover, launch, uuid},
+        {"aside",
+         [](S s) {
+             const std::string outer = s.world.path(fs::deathRowOuter);
+             files::create_directories(outer + "/" + fs::asideInner + "/" + uuid);
+             for (const std::string& closed : {outer, outer + "/" + fs::asideInner})
+                 ::chmod(closed.c_str(), 0700);
+         },
+         asideLeftover, launch, uuid},
         {"a copy among containers", [](S s) { files::create_directory(s.sibling(".zorvaned-copy-abcdef")); },
          copyLeftover, boot, "/.zorvaned-copy-abcdef"},
         {"a copy beside the old location of bundles",
