@@ -268,6 +268,12 @@ TEST(Tool, ExitCodesAndOutput) {
     };
     for (const ToolCall& row : rows)
         expectCall(daemon, row);
+    // A terminal that is too narrow for all columns has a line for each container.
+    const auto narrow =
+        runProgram({"/usr/bin/script", "-qec",
+                    "stty cols 60; TERM=dumb " + programPath("zorvanectl") + " --root " + daemon.root() + " list --all",
+                    "/dev/null"});
+    EXPECT_NE(narrow.output.find("\n\346\227\245  "), std::string::npos) << narrow.output;
 }
 
 // Goal: every mistake at the terminal is told with what was wrong and what to do, under the exit code that scripts tell
@@ -346,9 +352,9 @@ std::vector<std::string> completed(const DaemonProcess& daemon, std::vector<std:
     return found;
 }
 
-// Goal: help, manual page, completion and schemas speak of the same commands and options, and completion knows what is
-// there, and no word that a shell would run. Method: what completion offers, command by command, looked up in the
-// others.
+// Goal: help, manual page, completion and schemas speak of the same commands and options, the operator's page of all
+// findings, and completion knows what is there, and no word that a shell would run. Method: what completion offers,
+// command by command, looked up in the others; what is explained, looked up in the page.
 TEST(Tool, HelpPageCompletionAndSchemasAgree) {
     DaemonProcess daemon;
     daemon.start();
@@ -387,6 +393,15 @@ TEST(Tool, HelpPageCompletionAndSchemasAgree) {
         described.insert(name);
     printing.insert("error");
     EXPECT_EQ(printing, described);
+    std::string operation = readFile(packagingPath("man/zorvane-operation.7"));
+    std::erase(operation, '\\');
+    for (const auto& code : nlohmann::json::parse(daemon.tool({"--json", "explain"}).output)["codes"]) {
+        if (!code["code"].is_string())
+            continue; // no finding
+        for (const std::string& text :
+             {".B " + code["code"].get<std::string>() + "\n", code["whatToDo"].get<std::string>().substr(1) + ".\n"})
+            EXPECT_NE(operation.find(text), std::string::npos) << text;
+    }
     expectCall(daemon, {{"create", "org.plain", "--class", "2"}, 0, "created"});
     expectCall(daemon, {{"create", "$(touch x)", "--class", "2"}, 0, "created"});
     expectCall(daemon, {{"entitlements", "set", "a.b", "--app-group", "group.a"}, 0, "registered"});

@@ -90,30 +90,56 @@ std::optional<int> whichIsMissing(const Output& output, const Target& target, co
                              what);
 }
 
-std::vector<std::string> rowOf(const FoundContainer& container, const Listing& listing, ShownUsers& users) {
-    std::vector<std::string> row = {zorvane::uuidText(container.address.uuid)};
+/// For a person at a terminal that is too narrow for all: what a container is called comes first, its UUID is left out.
+enum class Width { all, narrow };
+
+std::vector<std::string> rowOf(const FoundContainer& container, const Listing& listing, ShownUsers& users,
+                               Width width) {
+    std::vector<std::string> row = {width == Width::all ? zorvane::uuidText(container.address.uuid)
+                                                        : printable(container.address.identifier)};
     if (listing.all) {
         row.emplace_back(zorvane::containerClassName(container.address.containerClass));
         row.push_back(printable(users(container.address.user)));
     }
     if (listing.withSize)
         row.push_back(shownBytes(container.bytes));
-    row.push_back(printable(container.address.identifier));
+    if (width == Width::all)
+        row.push_back(printable(container.address.identifier));
     if (listing.withPath)
         row.push_back(printable(container.path));
     return row;
 }
 
-std::vector<std::string> headerOf(const Listing& listing) {
-    std::vector<std::string> header = {"UUID"};
+std::vector<std::string> headerOf(const Listing& listing, Width width) {
+    std::vector<std::string> header = {width == Width::all ? "UUID" : "IDENTIFIER"};
     if (listing.all)
         header.insert(header.end(), {"CLASS", "USER"});
     if (listing.withSize)
         header.emplace_back("SIZE");
-    header.emplace_back("IDENTIFIER");
+    if (width == Width::all)
+        header.emplace_back("IDENTIFIER");
     if (listing.withPath)
         header.emplace_back("PATH");
     return header;
+}
+
+void showList(const Output& output, const FoundContainers& found, Listing listing, bool pathWanted, ShownUsers& users) {
+    const auto rows = [&](Width width) {
+        std::vector<std::vector<std::string>> all;
+        for (const FoundContainer& container : found.containers)
+            all.push_back(rowOf(container, listing, users, width));
+        return all;
+    };
+    const auto whole = rows(Width::all);
+    const auto header = headerOf(listing, Width::all);
+    if (!listing.all || fits(header, whole)) {
+        output.table(header, whole);
+        return;
+    }
+    listing.withPath = pathWanted;
+    output.table(headerOf(listing, Width::narrow), rows(Width::narrow));
+    output.line(std::string("(a wider terminal, or '| cat', shows UUIDs") +
+                (pathWanted ? ")" : " and paths; --path shows paths here)"));
 }
 
 void showUsage(const Output& output, const FoundContainers& found, const Listing& listing, ShownUsers& users) {
@@ -137,6 +163,11 @@ void showUsage(const Output& output, const FoundContainers& found, const Listing
         }
         if (listing.withPath)
             rows.back().push_back(printable(container.path));
+    }
+    if (!fits(header, rows)) { // the bars are what can be done without
+        header.erase(header.begin() + 1);
+        for (auto& row : rows)
+            row.erase(row.begin() + 1);
     }
     output.table(header, rows);
     output.line(shownBytes(bytesOf(found)) + " in " + countOf(found));
@@ -162,10 +193,7 @@ int list(const zorvane::ConnectOptions& connect, const Output& output, const Tar
         return exitDone;
     }
     ShownUsers users(connect.root);
-    std::vector<std::vector<std::string>> rows;
-    for (const FoundContainer& container : found->containers)
-        rows.push_back(rowOf(container, detailed, users));
-    output.table(headerOf(detailed), rows);
+    showList(output, *found, detailed, listing.withPath, users);
     showUnread(output, *found, users);
     return exitDone;
 }

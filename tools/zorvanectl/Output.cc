@@ -9,6 +9,7 @@
 #include <cstdio>
 #include <cwchar>
 #include <iterator>
+#include <numeric>
 #include <unistd.h>
 
 namespace zorvanectl {
@@ -88,15 +89,57 @@ std::string padded(const std::string& text, std::size_t columns) {
 constexpr std::size_t gap = 2;
 constexpr std::size_t continuationIndent = 4;
 
-/// The cells of a row, on as many lines as the terminal's width makes of them; without a terminal, on one.
-std::string rowOf(const std::vector<std::string>& cells, const std::vector<std::size_t>& widths, std::size_t columns) {
+using Row = std::vector<std::string>;
+
+/// The places of the cells of a table.
+struct Layout {
+    std::vector<std::size_t> widths;
+    std::size_t columns = SIZE_MAX; // of the terminal
+    bool lastBelow = false;         // the last cell of each row has a line to itself
+};
+
+std::size_t widthOf(const Row& cells, const std::vector<std::size_t>& widths) {
+    std::size_t taken = 0;
+    for (std::size_t column = 0; column + 1 < cells.size(); ++column)
+        taken += std::max(widths[column], columnsOf(cells[column])) + gap;
+    return taken + columnsOf(cells.back());
+}
+
+Layout layoutOf(const Row& header, const std::vector<Row>& rows) {
+    Layout layout;
+    if (const std::size_t columns = Screen::ofOutput().columns(); columns != 0)
+        layout.columns = columns;
+    for (std::size_t column = 0; column < header.size(); ++column) {
+        layout.widths.push_back(columnsOf(header[column]));
+        for (const Row& row : rows)
+            layout.widths.back() = std::max(layout.widths.back(), columnsOf(row[column]));
+    }
+    if (std::accumulate(layout.widths.begin(), layout.widths.end(), gap * (header.size() - 1)) <= layout.columns)
+        return layout;
+    // A cell that is wider than its column is to be moves the rest of its own row alone.
+    for (std::size_t column = 0; column < header.size(); ++column) {
+        std::size_t narrowest = layout.widths[column];
+        for (const Row& row : rows)
+            narrowest = std::min(narrowest, columnsOf(row[column]));
+        layout.widths[column] =
+            std::max({columnsOf(header[column]), narrowest, std::min(layout.widths[column], layout.columns / 3)});
+    }
+    const auto tooWide =
+        std::ranges::count_if(rows, [&](const Row& row) { return widthOf(row, layout.widths) > layout.columns; });
+    layout.lastBelow = 2 * static_cast<std::size_t>(tooWide) > rows.size();
+    return layout;
+}
+
+/// The cells of a row, on as many lines as the terminal's width makes of them.
+std::string textOf(const Row& cells, const Layout& layout) {
     std::string text;
     std::size_t taken = 0;
     for (std::size_t column = 0; column < cells.size(); ++column) {
         const bool isLast = column + 1 == cells.size();
-        const std::size_t width = std::max(widths[column], columnsOf(cells[column]));
-        if (columns != 0 && taken > continuationIndent &&
-            taken + (isLast ? columnsOf(cells[column]) : width) > columns) {
+        const std::size_t width = std::max(layout.widths[column], columnsOf(cells[column]));
+        const bool isBelow = isLast && layout.lastBelow && column != 0;
+        if (isBelow ||
+            (taken > continuationIndent && taken + (isLast ? columnsOf(cells[column]) : width) > layout.columns)) {
             text.erase(text.find_last_not_of(' ') + 1);
             text += "\n" + std::string(continuationIndent, ' ');
             taken = continuationIndent;
@@ -123,10 +166,18 @@ bool holdsMaps(const zorvane::List& list) {
     });
 }
 
+/// A text that is the only one among numbers names the rest of them.
 std::string onOneLine(const zorvane::Map& map) {
-    std::string text;
-    for (const auto& [key, element] : map)
-        text += (text.empty() ? "" : ", ") + printable(key) + " " + shown(element);
+    const auto isText = [](const auto& entry) { return std::holds_alternative<std::string>(entry.second.content); };
+    const bool hasName = std::ranges::count_if(map, isText) == 1;
+    std::string text = hasName ? shown(std::ranges::find_if(map, isText)->second) + ": " : "";
+    const char* separator = "";
+    for (const auto& entry : map) {
+        if (hasName && isText(entry))
+            continue;
+        text += separator + printable(entry.first) + " " + shown(entry.second);
+        separator = ", ";
+    }
     return text;
 }
 
@@ -152,23 +203,11 @@ void Output::remark(const std::string& text) const {
 
 void Output::table(const std::vector<std::string>& header, const std::vector<std::vector<std::string>>& rows) const {
     page();
-    const Screen& screen = Screen::ofOutput();
-    // A cell that is wider than its column is to be moves the rest of its own row alone.
-    const std::size_t wide = screen.columns() == 0 ? SIZE_MAX : screen.columns() / 3;
-    std::vector<std::size_t> widths;
-    for (std::size_t column = 0; column < header.size(); ++column) {
-        std::size_t narrowest = SIZE_MAX;
-        std::size_t widest = 0;
-        for (const auto& row : rows) {
-            narrowest = std::min(narrowest, columnsOf(row[column]));
-            widest = std::max(widest, columnsOf(row[column]));
-        }
-        widths.push_back(std::max({columnsOf(header[column]), std::min(narrowest, widest), std::min(widest, wide)}));
-    }
-    const std::string names = rowOf(header, widths, screen.columns());
-    line(screen.isColoured() ? underlined + names + plain : names);
-    for (const auto& row : rows)
-        line(rowOf(row, widths, screen.columns()));
+    const Layout layout = layoutOf(header, rows);
+    const std::string names = textOf(header, layout);
+    line(Screen::ofOutput().isColoured() ? underlined + names + plain : names);
+    for (const Row& row : rows)
+        line(textOf(row, layout));
 }
 
 void Output::tree(const std::string& name, const zorvane::Value& value, const std::string& indent) const {
@@ -241,6 +280,11 @@ int Output::finished(int exitCode) const {
         "what was asked for was done, or failed, all the same; make room, or have the output go elsewhere, "
         "and ask again with a command that only shows",
         "write the result");
+}
+
+bool fits(const std::vector<std::string>& header, const std::vector<std::vector<std::string>>& rows) {
+    const Layout layout = layoutOf(header, rows);
+    return std::ranges::all_of(rows, [&](const Row& row) { return widthOf(row, layout.widths) <= layout.columns; });
 }
 
 std::size_t columnsOf(const std::string& text) {

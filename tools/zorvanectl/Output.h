@@ -51,7 +51,8 @@ public:
     /// One line to standard error, beside a result.
     void remark(const std::string& text) const;
     /// Columns as wide as their widest cell, the header first; nothing but the header when there are no rows. A row
-    /// that is wider than the terminal goes on in another, indented line.
+    /// that is wider than the terminal goes on in another, indented line; where most are, the last column of each has
+    /// that line to itself.
     void table(const std::vector<std::string>& header, const std::vector<std::vector<std::string>>& rows) const;
     /// A name and what is under it, a line each, deeper ones indented.
     void tree(const std::string& name, const zorvane::Value& value, const std::string& indent = "") const;
@@ -78,6 +79,8 @@ private:
 [[nodiscard]] nlohmann::json toJson(const std::optional<std::uint64_t>& bytes);
 /// nullopt for null, and for what holds it: the daemon's values have none.
 [[nodiscard]] std::optional<zorvane::Value> fromJson(const nlohmann::json& json);
+/// Whether no row of such a table is wider than the terminal; without a terminal all fit.
+[[nodiscard]] bool fits(const std::vector<std::string>& header, const std::vector<std::vector<std::string>>& rows);
 /// How many columns of a terminal a text takes.
 [[nodiscard]] std::size_t columnsOf(const std::string& text);
 /// "1.4 MiB"; "an unknown number of bytes" for what could not be measured.
