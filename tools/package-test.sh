@@ -1,13 +1,15 @@
 #!/bin/bash
 # SPDX-License-Identifier: Apache-2.0
 # Tries the packages in a bare Debian 12 of its own: installed by the lines of the README, upgraded, downgraded, removed and
-# purged, with what users keep compared at each step. It boots under its own systemd, where the unit's filter of system calls
+# purged, with what users keep compared at each step. With the packages of an older version, the downgrade is one to that, and
+# clients built against either library talk through either library to either daemon. It boots under its own systemd, where the unit's filter of system calls
 # kills at the first call that it does not let pass; where none boots, namespaces do, and a stand-in runs what the unit runs.
 # Ends with the first surprise.
-# usage: tools/package-test.sh PACKAGES WORK-FOLDER
+# usage: tools/package-test.sh PACKAGES WORK-FOLDER [PACKAGES-OF-AN-OLDER-VERSION]
 set -euo pipefail
 packages="$(readlink -f "${1:?folder of the packages}")"
 work="$(readlink -m "${2:?work folder}")"
+older="$(readlink -f "${3:-$packages}")"
 cd "$(dirname "$(readlink -f "${BASH_SOURCE[0]}")")/.."
 base="$work/base"
 root="$work/root"
@@ -17,7 +19,7 @@ exposureMax=24
 if [[ -z "${ZORVANE_PACKAGE_TEST:-}" ]]; then
     # All that is started ends with the first process of the namespace; its mounts go with it.
     ZORVANE_PACKAGE_TEST=1 exec unshare --mount --pid --fork --kill-child --mount-proc --propagation private \
-        tools/package-test.sh "$packages" "$work"
+        tools/package-test.sh "$packages" "$work" "$older"
 fi
 
 fail() {
@@ -36,7 +38,7 @@ inside() {
 
 if [[ ! -e "$base/usr" ]]; then
     say "A bare Debian 12"
-    mirror="$(grep -rhoE 'https?://[^ ]*/debian/?( |$)' /etc/apt/sources.list /etc/apt/sources.list.d 2>/dev/null | head -n 1)"
+    mirror="$(grep -rhoE 'https?://[^ ]*/debian/?( |$)' /etc/apt/sources.list /etc/apt/sources.list.d 2>/dev/null | head -n 1)" || true
     rm -rf "$work/base.new"
     mkdir -p "$work"
     debootstrap --variant=minbase --include=systemd-sysv,dbus bookworm "$work/base.new" \
@@ -54,7 +56,8 @@ printf '[Service]\nSystemCallErrorNumber=\nWatchdogSec=4\n' >"$root/etc/systemd/
 
 first=
 if [[ -n "$(type -p systemd-nspawn)" ]]; then
-    systemd-nspawn --quiet --register=no --keep-unit --directory="$root" --boot --console=pipe </dev/null >"$work/boot.log" 2>&1 &
+    # A device's units have all capabilities and system calls; a container would lack some that sandboxes need.
+    systemd-nspawn --quiet --register=no --keep-unit --capability=CAP_NET_ADMIN --system-call-filter=@keyring --directory="$root" --boot --console=pipe </dev/null >"$work/boot.log" 2>&1 &
     for ((try = 0; try < 100; ++try)); do
         first="$(pgrep -P $! 2>/dev/null | head -n 1)" || true
         [[ -n "$first" && "$(inside 'systemctl is-system-running' 2>/dev/null)" =~ ^(running|degraded)$ ]] && break
@@ -128,8 +131,8 @@ After=zorvaned.service
 [Service]
 Type=notify
 WatchdogSec=1min
-ExecStart=/usr/sbin/zorvane-run --identifier org.example.notes --user 1000 -- /usr/bin/python3 -c "\
-import os, socket, time; \
+SuccessExitStatus=143
+ExecStart=/usr/sbin/zorvane-run --identifier org.example.notes --user 1000 -- /usr/bin/python3 -c "import os, socket, time; \
 manager = socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM); \
 manager.sendto(('READY=1\\nSTATUS=at home in ' + os.getcwd()).encode(), os.environ['NOTIFY_SOCKET']); \
 time.sleep(60)"
@@ -144,30 +147,64 @@ fi
 kept() {
     (cd "$root" && find home private/var/containers private/var/root/Library/Zorvane -type f -printf '%p %U %m\n' -exec sha256sum {} + | sort)
 }
-before="$(kept)"
 
-# repacked VERSION: the same packages under another version.
+# repacked FOLDER VERSION: the packages in FOLDER under another version.
 repacked() {
     local package
-    mkdir -p "$root/build/$1"
-    for package in "$root"/build/packages/*.deb; do
+    mkdir -p "$root/build/$2"
+    for package in "$1"/*.deb; do
+        [[ "$package" != *-dbgsym_* ]] || continue
         rm -rf "$work/repack"
         dpkg-deb -R "$package" "$work/repack"
-        sed -i -E "s/^Version: .*/Version: $1/; s/\(= [^)]*\)/(= $1)/" "$work/repack/DEBIAN/control"
-        dpkg-deb --root-owner-group -b "$work/repack" "$root/build/$1" >/dev/null
+        sed -i -E "s/^Version: .*/Version: $2/; s/\(= [^)]*\)/(= $2)/g; s/(libzorvane0) \(>= [^)]*\)/\1 (>= $2)/" "$work/repack/DEBIAN/control"
+        dpkg-deb --root-owner-group -b "$work/repack" "$root/build/$2" >/dev/null
     done
     rm -rf "$work/repack"
 }
+# builtAgainst FOLDER NAME: the C example, built against the library in FOLDER, and that library, in the bare system's /NAME.
+builtAgainst() {
+    local library
+    mkdir -p "$root/$2"
+    for package in "$1"/libzorvane0_*.deb "$1"/libzorvane-dev_*.deb; do dpkg-deb -x "$package" "$work/$2"; done
+    library="$(dirname "$(find "$work/$2" -name libzorvane.so)")"
+    cc -std=c99 packaging/examples/client/notes.c -I "$work/$2/usr/include" -L "$library" -lzorvane -o "$root/$2/notes"
+    cp "$library"/libzorvane.so.0* "$root/$2/"
+    rm -rf "${work:?}/$2"
+    sed "s|/usr/bin/zorvanectl|/$2/notes|; s|com.veltra.zorvanectl|org.example.notes|; s|<integer>0<|<integer>1000<|" \
+        packaging/examples/zorvanectl.plist >"$root/etc/zorvane/identities.d/$2.plist"
+}
+# Each client through each library finds the same container, and its own count in it.
+starts=0
+clientsWork() {
+    local client library answer
+    for client in older newer; do
+        for library in older newer; do
+            answer="$(inside "setpriv --reuid=ann --regid=ann --clear-groups env LD_LIBRARY_PATH=/$library /$client/notes")" || fail "the $client client fails with the $library library $1"
+            ((++starts))
+            [[ "$answer" == "$notes, start $starts" ]] || fail "the $client client with the $library library says $answer $1"
+        done
+    done
+}
 inside 'echo "# mine" >>/etc/zorvane/zorvaned.conf'
-for step in "upgraded 99.0" "downgraded 0.0.1"; do
-    read -r what version <<<"$step"
+builtAgainst "$older" older
+builtAgainst "$packages" newer
+notes="$(inside 'zorvanectl lookup org.example.notes --class data-app --user 1000 --json | python3 -c "import json, sys; print(json.load(sys.stdin)[\"path\"])"')"
+clientsWork "beside the first daemon"
+map="$(inside 'zorvanectl entitlements list; zorvanectl groups org.example.notes --user 1000')"
+before="$(kept)"
+for step in "upgraded 99.0 $packages" "downgraded 0.0.1 $older" "upgraded 99.1 $packages"; do
+    read -r what version folder <<<"$step"
     say "${what^} to $version, beside a running daemon"
-    repacked "$version"
-    inside "apt-get install -y -q --allow-downgrades /build/$version/*.deb" >"$work/$what.log" 2>&1 || fail "not $what: $work/$what.log"
+    repacked "$folder" "$version"
+    inside "apt-get install -y -q --allow-downgrades -o Dpkg::Options::=--force-confold /build/$version/*.deb" >"$work/$what.log" 2>&1 || fail "not $what: $work/$what.log"
     inside 'systemctl restart zorvaned && zorvanectl check && zorvanectl lookup org.example.notes --class data-app --user 1000' ||
         fail "the store is not whole when it is $what"
     [[ "$(kept)" == "$before" ]] || fail "what users keep has changed when $what: $(diff <(echo "$before") <(kept))"
+    [[ "$(inside 'zorvanectl entitlements list; zorvanectl groups org.example.notes --user 1000')" == "$map" ]] ||
+        fail "the map has changed when $what"
     inside 'grep -q "# mine" /etc/zorvane/zorvaned.conf' || fail "the configuration was overwritten when $what"
+    clientsWork "when $what"
+    before="$(kept)" # with the count of the clients
 done
 
 say "Removed, then purged: what users keep stays, and it says where"
