@@ -144,9 +144,8 @@ void ContainerCheck::checkClass(ContainerClass containerClass, std::uint32_t use
 }
 
 void ContainerCheck::checkDirectory(ClassDirectory& directory) {
-    const MetadataReader reader(look_.device().fileManager().disk(), directory.descriptor,
-                                std::make_shared<const std::string>(directory.url.path()), directory.user,
-                                CheckClassPath::yes);
+    const MetadataReader reader(look_.device().fileManager().disk(), directory.descriptor, directory.url.path(),
+                                directory.user, CheckClassPath::yes);
     look_.forEachName(directory.descriptor, directory.url, [&](const char* name) {
         if (name[0] == '.')
             checkHidden(directory.url, name);
@@ -256,10 +255,9 @@ std::optional<FileURL> ContainerCheck::rightPlace(const ClassDirectory& director
     std::vector<MobileUser> owners = look_.users();
     owners.push_back({look_.device().users().installer, {}});
     owners.push_back({look_.device().users().system, {}});
-    const auto parent = std::make_shared<const std::string>(directory.url.path());
     for (const auto& [userId, home] : owners) {
-        const MetadataReader reader(look_.device().fileManager().disk(), directory.descriptor, parent, userId,
-                                    CheckClassPath::no);
+        const MetadataReader reader(look_.device().fileManager().disk(), directory.descriptor, directory.url.path(),
+                                    userId, CheckClassPath::no);
         const auto record = reader.read(name);
         if (!record || !look_.device().users().mayOwn((*record)->containerClass(), userId))
             continue;

@@ -57,26 +57,29 @@ bool ZORContainerCache::isLeftOpen(const ZORError& error, const Key& key) const 
            (home && home->lookIfDue().state == UserHome::State::missing);
 }
 
-ZORContainerCache::Entry ZORContainerCache::entryOf(Record record) {
-    const std::size_t bytes = record->info() ? plist::heldBytes(*record->info()) : 0;
-    return {.record = std::move(record), .infoBytes = bytes};
+std::size_t ZORContainerCache::infoBytesOf(const ZORMetadata& record) {
+    return record.info() ? plist::heldBytes(*record.info()) : 0;
 }
 
-void ZORContainerCache::store(ClassCache& cache, Entry entry) {
-    ZOR_ASSERT(entry.record);
-    remove(cache, entry.record->identifier());
-    const std::size_t bytes = entry.infoBytes;
-    cache.entries.insert(std::move(entry));
-    cache.infoBytes += bytes;
+void ZORContainerCache::store(ClassCache& cache, Record record, std::size_t infoBytes) {
+    ZOR_ASSERT(record);
+    remove(cache, record->identifier());
+    if (infoBytes > 0)
+        cache.infoBytesOf[record.get()] = infoBytes;
+    cache.infoBytes += infoBytes;
+    cache.records.insert(std::move(record));
 }
 
 void ZORContainerCache::remove(ClassCache& cache, std::string_view identifier) {
-    const auto known = cache.entries.find(identifier);
-    if (known == cache.entries.end())
+    const auto known = cache.records.find(identifier);
+    if (known == cache.records.end())
         return;
-    ZOR_ASSERT(cache.infoBytes >= known->infoBytes);
-    cache.infoBytes -= known->infoBytes;
-    cache.entries.erase(known);
+    if (const auto bytes = cache.infoBytesOf.find(known->get()); bytes != cache.infoBytesOf.end()) {
+        ZOR_ASSERT(cache.infoBytes >= bytes->second);
+        cache.infoBytes -= bytes->second;
+        cache.infoBytesOf.erase(bytes);
+    }
+    cache.records.erase(known);
 }
 
 Result<ZORContainerCache::Found> ZORContainerCache::findRecord(const Key& key, const std::string& identifier) {
@@ -85,18 +88,18 @@ Result<ZORContainerCache::Found> ZORContainerCache::findRecord(const Key& key, c
     auto cache = _getCacheForUserId(key);
     if (!cache)
         return failedToRebuild(here, key, cache.error());
-    auto found = (*cache)->entries.find(std::string_view(identifier));
-    if (found == (*cache)->entries.end() && (*cache)->hidesSome) {
+    auto found = (*cache)->records.find(std::string_view(identifier));
+    if (found == (*cache)->records.end() && (*cache)->hidesSome) {
         cache = _getCacheForUserId(key, Wanted::whole);
         if (!cache)
             return failedToRebuild(here, key, cache.error());
-        found = (*cache)->entries.find(std::string_view(identifier));
+        found = (*cache)->records.find(std::string_view(identifier));
     }
-    if (found == (*cache)->entries.end())
+    if (found == (*cache)->records.end())
         return makeError(log_, {"containerForUser", __LINE__}, ErrorCode::notFound, nullptr, LogFlag::no,
                          "Cache: %s%s: Container Not Found with ID: %s", className(key.containerClass),
                          suffix(key.transient), ZOR_SHOWN(identifier));
-    return Found{.record = found->record, .place = found->record->place()};
+    return Found{.record = *found, .place = (*found)->place()};
 }
 
 ErrnoOr<bool> ZORContainerCache::lookForFile(const FileURL& container) {
@@ -165,12 +168,12 @@ std::optional<ZORContainerCache::LiveContainer> ZORContainerCache::liveContainer
         const auto cache = caches_.find(key);
         if (cache == caches_.end() || (home && cache->second.homeGeneration != seen.generation))
             return std::nullopt;
-        const auto found = cache->second.entries.find(std::string_view(identifier));
-        if (found == cache->second.entries.end() || !found->record->durable())
+        const auto found = cache->second.records.find(std::string_view(identifier));
+        if (found == cache->second.records.end() || !(*found)->durable())
             return std::nullopt;
-        live.record = found->record;
-        live.uuid = found->record->uuid();
-        place = found->record->place();
+        live.record = *found;
+        live.uuid = live.record->uuid();
+        place = live.record->place();
     }
     const FileURL container = place.url();
     if (!lookForFile(container).value_or(false))
@@ -230,7 +233,7 @@ Result<std::vector<ZORContainerCache::Record>> ZORContainerCache::listed(const K
                 if (!cache)
                     return failedToRebuild(here, key, cache.error());
                 homeGeneration = (*cache)->homeGeneration;
-                take((*cache)->entries, found);
+                take((*cache)->records, found);
             }
             return thoseOnDisk(here, key, std::move(found), homeGeneration);
         });
@@ -239,10 +242,10 @@ Result<std::vector<ZORContainerCache::Record>> ZORContainerCache::listed(const K
 
 Result<std::vector<ZORContainerCache::Record>>
 ZORContainerCache::allContainersForUser(std::uint32_t userId, ContainerClass containerClass, bool transient) {
-    return listed(Key{userId, containerClass, transient}, [](const auto& entries, std::vector<Found>& all) {
-        all.reserve(entries.size());
-        for (const Entry& entry : entries)
-            all.push_back({.record = entry.record, .place = entry.record->place()});
+    return listed(Key{userId, containerClass, transient}, [](const auto& records, std::vector<Found>& all) {
+        all.reserve(records.size());
+        for (const Record& record : records)
+            all.push_back({.record = record, .place = record->place()});
     });
 }
 
@@ -279,12 +282,12 @@ Result<ZORContainerCache::PageOfRecords> ZORContainerCache::pageOfContainersForU
         return left->identifier() < right->identifier();
     };
     result.records =
-        TRY(listed(Key{userId, containerClass, transient}, [&](const auto& entries, std::vector<Found>& found) {
+        TRY(listed(Key{userId, containerClass, transient}, [&](const auto& all, std::vector<Found>& found) {
             std::vector<Record> records;
-            records.reserve(entries.size());
-            for (const Entry& entry : entries)
-                if (page.after.empty() || entry.record->identifier() > page.after)
-                    records.push_back(entry.record);
+            records.reserve(all.size());
+            for (const Record& record : all)
+                if (page.after.empty() || record->identifier() > page.after)
+                    records.push_back(record);
             const auto end =
                 records.begin() + static_cast<std::ptrdiff_t>(std::min(records.size(), page.containersMax));
             std::partial_sort(records.begin(), end, records.end(), before);
@@ -310,7 +313,7 @@ ZORContainerCache::Held ZORContainerCache::heldByUser(std::uint32_t userId) {
     Held all;
     for (auto cache = caches_.lower_bound(Key{userId, ContainerClass::undefined, false});
          cache != caches_.end() && cache->first.userId == userId; ++cache) {
-        all.containers += cache->second.entries.size();
+        all.containers += cache->second.records.size();
         all.infoBytes += cache->second.infoBytes;
     }
     return all;
@@ -327,14 +330,14 @@ Result<void> ZORContainerCache::addContainerMetadata(const Record& record, std::
             return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes, "Invalid input: URL: %s",
                              "(null)");
         const Key key{userId, record->containerClass(), transient};
-        Entry entry = entryOf(record);
+        const std::size_t infoBytes = infoBytesOf(*record);
         {
             const MutexLock held(cacheLock_);
             const auto cache = _getCacheForUserId(key);
             if (!cache)
                 return failedToRebuild(here, key, cache.error());
             record->setPlace(std::move(place));
-            store(**cache, std::move(entry));
+            store(**cache, record, infoBytes);
             noteChange(**cache);
         }
         traceIdentifier(here, key, "Added", record->identifier());
@@ -377,7 +380,7 @@ ZORContainerCache::Counts ZORContainerCache::counts() {
     const MutexLock held(cacheLock_);
     Counts counts{.classCaches = caches_.size()};
     for (const auto& [key, cache] : caches_)
-        counts.records += cache.entries.size();
+        counts.records += cache.records.size();
     return counts;
 }
 
@@ -385,9 +388,9 @@ std::vector<UUID> ZORContainerCache::withUnsavedInfo() {
     std::vector<UUID> uuids;
     const MutexLock held(cacheLock_);
     for (const auto& [key, cache] : caches_)
-        for (const Entry& entry : cache.entries)
-            if (!entry.record->infoIsSaved())
-                uuids.push_back(entry.record->uuid());
+        for (const Record& record : cache.records)
+            if (!record->infoIsSaved())
+                uuids.push_back(record->uuid());
     return uuids;
 }
 

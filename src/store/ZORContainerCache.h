@@ -31,6 +31,7 @@
 #include <set>
 #include <string>
 #include <string_view>
+#include <unordered_map>
 #include <unordered_set>
 #include <vector>
 
@@ -135,25 +136,24 @@ public:
     [[nodiscard]] std::vector<UUID> withUnsavedInfo() ZOR_EXCLUDES(cacheLock_);
 
 private:
-    struct Entry {
-        Record record;
-        std::size_t infoBytes; // of memory, as the record had when it was stored
-    };
     struct IdentifierOf {
         using is_transparent = void;
-        static std::string_view of(std::string_view identifier) { return identifier; }
-        static std::string_view of(const Entry& entry) { return entry.record->identifier(); }
-        std::size_t operator()(const auto& key) const { return std::hash<std::string_view>()(of(key)); }
-        bool operator()(const auto& left, const auto& right) const { return of(left) == of(right); }
+        static std::string_view of(std::string_view identifier) noexcept { return identifier; }
+        static std::string_view of(const Record& record) noexcept { return record->identifier(); }
+        /// That it throws nothing has the table keep no hash beside each record.
+        std::size_t operator()(const auto& key) const noexcept { return std::hash<std::string_view>()(of(key)); }
+        bool operator()(const auto& left, const auto& right) const noexcept { return of(left) == of(right); }
     };
     struct ClassCache {
-        std::unordered_set<Entry, IdentifierOf, IdentifierOf> entries;
-        std::size_t infoBytes = 0; // the sum of the entries'
+        std::unordered_set<Record, IdentifierOf, IdentifierOf> records;
+        /// Memory of the info values of those that have some, as each had when it was stored.
+        std::unordered_map<const ZORMetadata*, std::size_t> infoBytesOf;
+        std::size_t infoBytes = 0; // the sum
         /// The generation of the home that they were read from.
         std::uint64_t homeGeneration = 0;
         /// There may be others, which an encryption hid when the directory was read.
         bool hidesSome = false;
-        /// Another one after each change of the entries.
+        /// Another one after each change of the records.
         std::uint64_t serial = 0;
     };
     struct Key {
@@ -202,7 +202,7 @@ private:
     /// Code 44 or 47 unless the look for the file found it; 43 where it is hidden.
     Result<void> checkOnDisk(Here here, const Key& key, const Found& found, const ErrnoOr<bool>& looked,
                              const char* foundFormatPrefix);
-    /// The containers that `take` chooses of a class's entries, under the cache's lock, and whose files are there.
+    /// The containers that `take` chooses of a class's records, under the cache's lock, and whose files are there.
     template <typename Take>
     Result<std::vector<Record>> listed(const Key& key, const Take& take);
     /// Error 43 also when they were of a home that has changed since.
@@ -210,8 +210,8 @@ private:
                                             std::uint64_t homeGeneration);
     /// Behind a class's name in messages.
     static const char* suffix(bool transient) { return transient ? "(transient)" : ""; }
-    static Entry entryOf(Record record);
-    static void store(ClassCache& cache, Entry entry);
+    static std::size_t infoBytesOf(const ZORMetadata& record);
+    static void store(ClassCache& cache, Record record, std::size_t infoBytes);
     static void remove(ClassCache& cache, std::string_view identifier);
     void noteChange(ClassCache& cache) ZOR_REQUIRES(cacheLock_) { cache.serial = ++serials_; }
     /// A level-7 line under the operation's own name, which a lambda inside it does not have.

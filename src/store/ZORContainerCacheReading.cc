@@ -12,6 +12,7 @@
 #include <exception>
 #include <functional>
 #include <iterator>
+#include <malloc.h>
 #include <map>
 #include <memory>
 #include <optional>
@@ -133,8 +134,7 @@ Result<void> ClassDirectoryReader::forEach(const std::function<void(std::shared_
     if (entries.error())
         return failed(entries.error());
 
-    const MetadataReader reader(disk, directory->get(), std::make_shared<const std::string>(directory_.path()), userId_,
-                                CheckClassPath::yes);
+    const MetadataReader reader(disk, directory->get(), directory_.path(), userId_, CheckClassPath::yes);
     std::vector<std::shared_ptr<ZORMetadata>> records(names.starts.size());
     Refusals refusals;
     fs::forEachStretch(records.size(), [&](std::size_t begin, std::size_t end) {
@@ -164,6 +164,15 @@ constexpr int lookOverShare = 100;
 
 /// A class directory is read so often in a row while operations change the class meanwhile.
 constexpr int readsMax = 16;
+
+/// The reading of so many leaves holes in the memory, a tenth of the size of the records that it made.
+constexpr std::size_t recordsWithHoles = 10'000;
+
+void giveHolesBack() {
+#ifdef __GLIBC__
+    ::malloc_trim(0);
+#endif
+}
 
 } // namespace
 
@@ -220,10 +229,12 @@ Result<ZORContainerCache::ClassCache*> ZORContainerCache::_getCacheForUserId(con
         if (drops != drops_ || (now ? now->serial : 0) != serial)
             continue;
         if (now)
-            for (const Entry& known : now->entries)
-                if (const auto again = built.entries.find(known);
-                    again != built.entries.end() && again->record->place().name() == known.record->place().name())
-                    store(built, known);
+            for (const Record& known : now->records)
+                if (const auto again = built.records.find(known);
+                    again != built.records.end() && (*again)->place().name() == known->place().name()) {
+                    const auto bytes = now->infoBytesOf.find(known.get());
+                    store(built, known, bytes == now->infoBytesOf.end() ? 0 : bytes->second);
+                }
         ClassCache& cache = caches_[key] = std::move(built);
         noteChange(cache);
         if (wanted == Wanted::whole && cache.hidesSome)
@@ -275,11 +286,14 @@ Result<ZORContainerCache::ClassCache> ZORContainerCache::readClassDirectory(cons
         return posixError(ZOR_HERE, Errno(ENOENT), "User %u has no directory for class %s", key.userId,
                           className(key.containerClass));
     ClassDirectoryReader reader(log_, fileManager_, *directory, key.userId);
-    ClassCache cache{.entries = {}, .homeGeneration = seen.generation};
+    ClassCache cache{.records = {}, .infoBytesOf = {}, .homeGeneration = seen.generation};
     TRY(reader.forEach([&](Record record) {
         record->setTransient(key.transient);
-        store(cache, entryOf(std::move(record)));
+        const std::size_t infoBytes = infoBytesOf(*record);
+        store(cache, std::move(record), infoBytes);
     }));
+    if (cache.records.size() >= recordsWithHoles)
+        giveHolesBack();
     cache.hidesSome = reader.metHidden();
     // A daemon that was killed may have left containers here that are not on the disk yet; who finds one here is told
     // that it exists.
@@ -294,8 +308,8 @@ bool ZORContainerCache::lookOver(const Key& key, const Found& gone) {
     const auto directory = configuration_.containerDirectoryURLForUser(key.userId, key.containerClass, key.transient);
     const MutexLock held(cacheLock_);
     const auto stillLies = [&](const ClassCache& cache) {
-        const auto known = cache.entries.find(std::string_view(gone.record->identifier()));
-        return known != cache.entries.end() && known->record->place().name() == gone.place.name();
+        const auto known = cache.records.find(std::string_view(gone.record->identifier()));
+        return known != cache.records.end() && (*known)->place().name() == gone.place.name();
     };
     const auto before = caches_.find(key);
     if (before == caches_.end() || beingRead_.contains(key) || !stillLies(before->second))
@@ -311,7 +325,8 @@ bool ZORContainerCache::lookOver(const Key& key, const Found& gone) {
         return ClassDirectoryReader(log_, fileManager_, *directory, key.userId).forEach([&](Record record) {
             names.insert(record->place().name());
             record->setTransient(key.transient);
-            store(there, entryOf(std::move(record)));
+            const std::size_t infoBytes = infoBytesOf(*record);
+            store(there, std::move(record), infoBytes);
         });
     });
     const auto end = Clock::now();
@@ -324,16 +339,16 @@ bool ZORContainerCache::lookOver(const Key& key, const Found& gone) {
     // Only of what has gone from its place: others may be in the hands of an operation. When there has been one, the
     // place of the one that was looked for is all that is known to be the same.
     const bool unchanged = now->second.serial == serial;
-    for (const Entry& entry : there.entries) {
-        const auto cached = now->second.entries.find(std::string_view(entry.record->identifier()));
-        if (cached == now->second.entries.end() || names.contains(cached->record->place().name()))
+    for (const Record& found : there.records) {
+        const auto cached = now->second.records.find(found);
+        if (cached == now->second.records.end() || names.contains((*cached)->place().name()))
             continue;
-        if (!unchanged && (cached->record->identifier() != gone.record->identifier() || !stillLies(now->second)))
+        if (!unchanged && ((*cached)->identifier() != gone.record->identifier() || !stillLies(now->second)))
             continue;
         log_.write(logLevelNotice, __func__, "Cache: %s%s: Identifier: %s was moved from %s to %s",
-                   className(key.containerClass), suffix(key.transient), ZOR_SHOWN(entry.record->identifier()),
-                   cached->record->url().c_str(), entry.record->url().c_str());
-        store(now->second, entry);
+                   className(key.containerClass), suffix(key.transient), ZOR_SHOWN(found->identifier()),
+                   (*cached)->url().c_str(), found->url().c_str());
+        store(now->second, found, infoBytesOf(*found));
     }
     noteChange(now->second);
     return true;

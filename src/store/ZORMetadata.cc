@@ -50,27 +50,28 @@ std::string_view withoutLastComponent(std::string_view path) {
 #define ZOR_REFUSE(rule, ...)                                                                                          \
     return refusal(MetadataRule::rule, ErrorCode::metadataInvalid, __LINE__, formatted(__VA_ARGS__))
 
-ContainerPlace::ContainerPlace(std::shared_ptr<const std::string> parentPath, std::string_view name)
-    : parentPath_(std::move(parentPath)) {
+ContainerPlace::ContainerPlace(std::shared_ptr<const ContainerParent> parent, std::string_view name)
+    : parent_(std::move(parent)) {
     const auto uuid = UUID::parse(name);
     if (uuid && uuid->string() == name)
         uuid_ = *uuid;
     else
-        otherName_ = std::make_shared<const std::string>(name);
+        parent_ = std::make_shared<const ContainerParent>(parent_->path, std::string(name));
 }
 
 ContainerPlace::ContainerPlace(const FileURL& url)
-    : ContainerPlace(std::make_shared<const std::string>(url.deletingLastPathComponent().path()),
+    : ContainerPlace(std::make_shared<const ContainerParent>(url.deletingLastPathComponent().path()),
                      url.lastPathComponent()) {}
 
 FileURL ContainerPlace::url() const {
     if (empty())
         return {};
+    const std::string own = name();
     std::string path;
-    path.reserve(parentPath_->size() + 1 + (otherName_ ? otherName_->size() : 36));
-    path += *parentPath_;
+    path.reserve(parentPath().size() + 1 + own.size());
+    path += parentPath();
     path += '/';
-    path += name();
+    path += own;
     return FileURL::directory(std::move(path));
 }
 
@@ -169,10 +170,10 @@ std::expected<std::shared_ptr<ZORMetadata>, MetadataRefusal> parseMetadata(std::
         info ? std::make_shared<const plist::Dictionary>(*info->asDictionary()) : nullptr, place);
 }
 
-MetadataReader::MetadataReader(platform::Disk& disk, int directory, std::shared_ptr<const std::string> parentPath,
-                               std::uint32_t userId, CheckClassPath checkClassPath, std::optional<uid_t> formerOwner)
-    : disk_(disk), directory_(directory), parentPath_(std::move(parentPath)), userId_(userId),
-      checkClassPath_(checkClassPath), formerOwner_(formerOwner) {}
+MetadataReader::MetadataReader(platform::Disk& disk, int directory, std::string directoryPath, std::uint32_t userId,
+                               CheckClassPath checkClassPath, std::optional<uid_t> formerOwner)
+    : disk_(disk), directory_(directory), parent_(std::make_shared<const ContainerParent>(std::move(directoryPath))),
+      userId_(userId), checkClassPath_(checkClassPath), formerOwner_(formerOwner) {}
 
 Result<std::shared_ptr<ZORMetadata>> MetadataReader::read(const char* name) const {
     auto judged = judge(name);
@@ -182,7 +183,7 @@ Result<std::shared_ptr<ZORMetadata>> MetadataReader::read(const char* name) cons
 }
 
 std::expected<std::shared_ptr<ZORMetadata>, MetadataRefusal> MetadataReader::judge(const char* name) const {
-    const ContainerPlace place(parentPath_, name);
+    const ContainerPlace place(parent_, name);
     const std::string relative = std::string(name) + "/" + names::metadataFile;
     const auto bytes = fs::readOwnedFile(disk_, directory_, relative.c_str(), fs::metadataFileBytesMax, formerOwner_);
     if (!bytes) {
@@ -203,9 +204,8 @@ Result<std::shared_ptr<ZORMetadata>> readAndValidateMetadataAtUrl(const Log& log
     const FileURL parent = url.deletingLastPathComponent();
     const auto directory = fileManager.resolver().openDirectoryPath(parent);
     // Without its directory, the read below says what is wrong with the container.
-    const MetadataReader reader(fileManager.disk(), directory ? directory->get() : -1,
-                                std::make_shared<const std::string>(parent.path()), userId, checkClassPath,
-                                formerOwner);
+    const MetadataReader reader(fileManager.disk(), directory ? directory->get() : -1, parent.path(), userId,
+                                checkClassPath, formerOwner);
     auto record = reader.read(std::string(url.lastPathComponent()).c_str());
     if (!record)
         logError(log, record.error());

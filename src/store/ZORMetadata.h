@@ -4,8 +4,8 @@
 // The file is all that lasts; a record is its copy in memory plus where the container lies. Records in the cache are
 // shared between threads and have no lock: whoever changes one holds the identifier or all-identifiers lock of the
 // operation, and what a reply needs is read before that lock is released. There may be hundreds of thousands of
-// records, so one holds no more than its data: directories are shared between the records that lie in them, and a
-// directory name that is a UUID is kept as its 16 bytes.
+// records, so one holds no more than its data: directories are shared between the records that lie in them, a
+// directory name that is a UUID is kept as its 16 bytes, and with what shares it, a record fills 128 bytes of memory.
 #pragma once
 
 #include "base/ContainerClass.h"
@@ -25,22 +25,31 @@
 
 namespace zor {
 
-/// The place of a container: a directory that many share, and its own name in it.
+/// The directory that a container lies in: many share one.
+struct ContainerParent {
+    std::string path;
+    /// The name of the one container that has it for itself, because that is no UUID in canonical form; else empty.
+    std::string childName{};
+};
+
+/// The place of a container: its directory, and its own name in it.
 class ContainerPlace {
 public:
     ContainerPlace() = default;
-    ContainerPlace(std::shared_ptr<const std::string> parentPath, std::string_view name);
+    /// `parent` has no name of a child.
+    ContainerPlace(std::shared_ptr<const ContainerParent> parent, std::string_view name);
     explicit ContainerPlace(const FileURL& url);
 
-    [[nodiscard]] bool empty() const { return !parentPath_; }
-    [[nodiscard]] std::string name() const { return otherName_ ? *otherName_ : uuid_.string(); }
-    [[nodiscard]] const std::string& parentPath() const { return *parentPath_; }
+    [[nodiscard]] bool empty() const { return !parent_; }
+    [[nodiscard]] std::string name() const { return hasOtherName() ? parent_->childName : uuid_.string(); }
+    [[nodiscard]] const std::string& parentPath() const { return parent_->path; }
     [[nodiscard]] FileURL url() const;
 
 private:
-    std::shared_ptr<const std::string> parentPath_;
+    [[nodiscard]] bool hasOtherName() const { return parent_ && !parent_->childName.empty(); }
+
+    std::shared_ptr<const ContainerParent> parent_;
     UUID uuid_;
-    std::shared_ptr<const std::string> otherName_; // when the name is not a UUID in canonical form
 };
 
 class ZORMetadata {
@@ -75,17 +84,17 @@ public:
     [[nodiscard]] bool transient() const { return transient_; }
     void setTransient(bool transient) { transient_ = transient; }
     /// Whether it was found rather than made, when it was last asked for. Set by lookups, which may be several at once.
-    [[nodiscard]] bool existed() const { return existed_.load(std::memory_order_relaxed); }
-    void setExisted(bool existed) { existed_.store(existed, std::memory_order_relaxed); }
+    [[nodiscard]] bool existed() const { return (marks_.load(std::memory_order_relaxed) & existedMark) != 0; }
+    void setExisted(bool existed) { setMark(existedMark, existed, std::memory_order_relaxed); }
     /// False from a move into its place until that move has been synced: who finds it meanwhile syncs before it tells
     /// anybody. Set to true without the identifier locks.
-    [[nodiscard]] bool durable() const { return durable_.load(std::memory_order_acquire); }
-    void setDurable(bool durable) { durable_.store(durable, std::memory_order_release); }
+    [[nodiscard]] bool durable() const { return (marks_.load(std::memory_order_acquire) & durableMark) != 0; }
+    void setDurable(bool durable) { setMark(durableMark, durable, std::memory_order_release); }
 
     /// False from a write of changed info values that failed until one that did not: clients are shown what is not on
     /// the disk. Under the container's lock for writing; read without.
-    [[nodiscard]] bool infoIsSaved() const { return infoIsSaved_.load(std::memory_order_relaxed); }
-    void setInfoIsSaved(bool isSaved) { infoIsSaved_.store(isSaved, std::memory_order_relaxed); }
+    [[nodiscard]] bool infoIsSaved() const { return (marks_.load(std::memory_order_relaxed) & infoIsSavedMark) != 0; }
+    void setInfoIsSaved(bool isSaved) { setMark(infoIsSavedMark, isSaved, std::memory_order_relaxed); }
 
     /// The dictionary that the file holds.
     [[nodiscard]] plist::Dictionary fileContent() const;
@@ -94,6 +103,19 @@ public:
     Result<void> writeMetadataToDiskWithError(const Log& log, ZORFileManager& fileManager) const;
 
 private:
+    static constexpr std::uint8_t existedMark = 1U << 0;
+    static constexpr std::uint8_t durableMark = 1U << 1;
+    static constexpr std::uint8_t infoIsSavedMark = 1U << 2;
+    /// Writes nothing that is so already: lookups of one container may be many at once.
+    void setMark(std::uint8_t mark, bool isSet, std::memory_order order) {
+        if (((marks_.load(std::memory_order_relaxed) & mark) != 0) == isSet)
+            return;
+        if (isSet)
+            marks_.fetch_or(mark, order);
+        else
+            marks_.fetch_and(static_cast<std::uint8_t>(~mark), order);
+    }
+
     std::string identifier_;
     Info info_;
     ContainerPlace place_;
@@ -101,9 +123,7 @@ private:
     std::uint32_t uid_;
     std::uint8_t containerClass_;
     bool transient_ = false;
-    std::atomic<bool> existed_{false};
-    std::atomic<bool> durable_{true};
-    std::atomic<bool> infoIsSaved_{true};
+    std::atomic<std::uint8_t> marks_{durableMark | infoIsSavedMark};
 };
 
 enum class CheckClassPath { no, yes };
@@ -129,10 +149,9 @@ Result<std::shared_ptr<ZORMetadata>> readAndValidateMetadataAtUrl(const Log& log
 /// Errors are made without a log line, so that threads may share the work and one of them can say the errors in order.
 class MetadataReader {
 public:
-    /// `directory` is open and stays so; `parentPath` is its path.
-    MetadataReader(platform::Disk& disk, int directory, std::shared_ptr<const std::string> parentPath,
-                   std::uint32_t userId, CheckClassPath checkClassPath,
-                   std::optional<uid_t> formerOwner = std::nullopt);
+    /// `directory` is open and stays so.
+    MetadataReader(platform::Disk& disk, int directory, std::string directoryPath, std::uint32_t userId,
+                   CheckClassPath checkClassPath, std::optional<uid_t> formerOwner = std::nullopt);
     /// The container `name` in the directory. Any thread.
     [[nodiscard]] Result<std::shared_ptr<ZORMetadata>> read(const char* name) const;
     /// The same, with the rule that it breaks.
@@ -141,7 +160,7 @@ public:
 private:
     platform::Disk& disk_;
     const int directory_;
-    const std::shared_ptr<const std::string> parentPath_;
+    const std::shared_ptr<const ContainerParent> parent_;
     const std::uint32_t userId_;
     const CheckClassPath checkClassPath_;
     const std::optional<uid_t> formerOwner_;
