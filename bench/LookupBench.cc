@@ -28,7 +28,7 @@ std::vector<Figure> measureLookup(const Settings& settings) {
     return {roundTripsInTurns(
                 blocks, [&] { return roundTrips(client, request, reply, requests); },
                 [&] { return roundTrips(floorClient, request, reply, requests); })
-                .figure("lookup.p50", "lookup round trip, one processor, p50", 2.0, request, reply)};
+                .figure("lookup.p50", "lookup round trip, one processor, p50", 1.65, request, reply)};
 }
 
 } // namespace zor::bench

@@ -40,11 +40,11 @@ std::size_t wholeFrame(Bytes stream, bool& broken) {
 
 class Listener {
 public:
-    Listener(Bytes stream, unsigned framesPerTurn, bool servesLater, std::size_t cut)
+    Listener(Bytes stream, int socket, unsigned framesPerTurn, bool servesLater, std::size_t cut)
         : rest_(stream), framesPerTurn_(framesPerTurn), servesLater_(servesLater),
           scratchUsed_(std::min(platform::listenerSmallInputBytes + cut, platform::listenerScratchBytes)) {
         account_ = charges_.openConnection(1, false);
-        input_.open(charges_, *account_, ::getpid());
+        input_.open(charges_, *account_, socket, ::getpid());
     }
     ~Listener() {
         input_.close();
@@ -53,16 +53,17 @@ public:
 
     /// Takes what the socket has, as a connection does. False when the stream is broken.
     bool take(int socket) {
-        for (;;) {
+        for (bool saidLast = false;;) {
             unsigned left = framesPerTurn_;
             if (!serveArrived(left))
                 return false;
             if (left > 0) {
                 const auto received = input_.receive(socket, scratch_);
-                if (received != platform::ListenerInput::Received::bytes) {
-                    mustHold(received == platform::ListenerInput::Received::nothing);
+                if (received == platform::ListenerInput::Received::nothing)
                     return input_.keep();
-                }
+                mustHold(!saidLast);
+                saidLast = received == platform::ListenerInput::Received::lastBytes;
+                mustHold(saidLast || received == platform::ListenerInput::Received::bytes);
                 if (!servesLater_ && !serveArrived(left))
                     return false;
             }
@@ -124,7 +125,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* bytes, std::size_t siz
     const int on = 1;
     mustHold(::setsockopt(receiver.get(), SOL_SOCKET, SO_PASSCRED, &on, sizeof on) == 0);
 
-    Listener listener(stream, framesPerTurn, servesLater, cut);
+    Listener listener(stream, receiver.get(), framesPerTurn, servesLater, cut);
     bool whole = true;
     for (std::size_t done = 0; done < stream.size() && whole;) {
         const ssize_t sent =

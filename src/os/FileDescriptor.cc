@@ -61,7 +61,15 @@ ErrnoOr<FileDescriptor> remembered(int directory, const char* path, int flags, s
 }
 
 bool hasParentComponent(std::string_view path) {
-    return path == ".." || path.starts_with("../") || path.ends_with("/..") || path.find("/../") != path.npos;
+    for (std::size_t at = path.find(".."); at != path.npos; at = path.find("..", at + 1))
+        if ((at == 0 || path[at - 1] == '/') && (at + 2 == path.size() || path[at + 2] == '/'))
+            return true;
+    return false;
+}
+
+/// Whether a path is certain to lead down from where it begins when it follows no link.
+bool leadsDown(const char* path) {
+    return path[0] != '/' && !hasParentComponent(path);
 }
 
 } // namespace
@@ -71,15 +79,18 @@ ErrnoOr<FileDescriptor> openBeneath(int directory, const char* relativePath, int
 }
 
 ErrnoOr<FileDescriptor> openBeneathOnMount(int directory, const char* relativePath, int flags) {
-    // These alone lead out where no link is followed. RESOLVE_BENEATH would find them too, at a tenth of the price of
-    // the whole call, which walks of large trees make for every directory.
-    if (relativePath[0] == '/' || hasParentComponent(relativePath))
+    // RESOLVE_BENEATH would find that too, at a tenth of the price of the whole call, which walks of large trees make
+    // for every directory.
+    if (!leadsDown(relativePath))
         return Errno(EXDEV);
     return resolve(directory, relativePath, flags, 0, RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS | RESOLVE_NO_XDEV);
 }
 
 ErrnoOr<FileDescriptor> openBeneathRemembered(int directory, const char* relativePath, int flags) {
-    return remembered(directory, relativePath, flags, RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS);
+    // The same price, for every lookup.
+    if (!leadsDown(relativePath))
+        return Errno(EXDEV);
+    return remembered(directory, relativePath, flags, RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS);
 }
 
 ErrnoOr<FileDescriptor> openRemembered(const char* path) {

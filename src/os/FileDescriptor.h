@@ -61,8 +61,9 @@ private:
 /// mounted there is not asked. A ".." is refused even where it stays inside.
 [[nodiscard]] ErrnoOr<FileDescriptor> openBeneathOnMount(int directory, const char* relativePath, int flags);
 
-/// The same as openBeneath with O_PATH, out of the kernel's memory of names alone: no file system is asked, so none can
-/// make it wait. EAGAIN, as often as it likes, where one would have to be asked, or where the kernel has no such call.
+/// The same as openBeneath with O_PATH, out of the kernel's memory of names alone, and a ".." is refused even where it
+/// stays inside: no file system is asked, so none can make it wait. EAGAIN, as often as it likes, where one would have
+/// to be asked, or where the kernel has no such call.
 [[nodiscard]] ErrnoOr<FileDescriptor> openBeneathRemembered(int directory, const char* relativePath, int flags);
 
 /// The same for a whole path, whose links are followed.

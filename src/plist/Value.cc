@@ -96,7 +96,7 @@ Dictionary::const_iterator Dictionary::end() const {
 }
 
 const Value* Dictionary::find(std::string_view key) const {
-    // Of a few keys most are told apart by their lengths, without a look at their bytes.
+    // Most keys of a few are told apart by their lengths, without a look at their bytes.
     if (entries_.size() <= fewEntries) {
         for (const Entry& entry : entries_)
             if (entry.first == key)
