@@ -62,7 +62,11 @@ private:
     [[nodiscard]] bool holdsOthers(std::string_view subdirectory) const;
     ZORError topLevelError(Here here, Errno error, const char* verb);
     ZORError subdirectoryError(Here here, const char* subdirectory, Errno error, const char* verb);
-    Result<void> giveAway(const Made& made, const char* subdirectory);
+    enum class Modes { right, unknown };
+    Result<void> giveAway(const Made& made, const char* subdirectory, Modes modes);
+    /// The process's umask, and what the top directory hands down, change the modes of all subdirectories alike: the
+    /// first one, which lies in it, tells of them all. Nobody else can have changed one yet.
+    [[nodiscard]] Modes modesOfSubdirectories() const;
 
     const Log& log_;
     ZORFileManager& fileManager_;
@@ -152,15 +156,20 @@ Result<void> ContainerBuilder::writeMetadata(const ZORMetadata& record) {
                      "Failed to write metadata dictionary to URL %s", staging_.c_str());
 }
 
-Result<void> ContainerBuilder::giveAway(const Made& made, const char* subdirectory) {
+ContainerBuilder::Modes ContainerBuilder::modesOfSubdirectories() const {
     struct stat status{};
-    Errno error = fs::statusOfName(made.parent, made.name, status);
-    const char* verb = "lstat";
-    // The process's umask, or what the directory hands down, may have changed the mode.
-    if (!error && (status.st_mode & permissionBits) != layout_.subdirectoryMode) {
+    const bool isRight = !subdirectories_.empty() && subdirectories_.front().parent == directory_.get() &&
+                         !fs::statusOfName(directory_.get(), subdirectories_.front().name, status) &&
+                         (status.st_mode & permissionBits) == layout_.subdirectoryMode;
+    return isRight ? Modes::right : Modes::unknown;
+}
+
+Result<void> ContainerBuilder::giveAway(const Made& made, const char* subdirectory, Modes modes) {
+    Errno error;
+    const char* verb = "chmod";
+    if (modes != Modes::right) {
         const auto opened = openBeneath(made.parent, made.name, O_PATH | O_DIRECTORY | O_NOFOLLOW);
         error = opened ? disk_.changeMode(opened->get(), layout_.subdirectoryMode) : opened.error();
-        verb = "chmod";
     }
     if (const std::uint32_t owner = layout_.subdirectoryOwner; !error && owner != ownerUnchanged) {
         error = disk_.changeOwnerOf(made.parent, made.name, owner, owner);
@@ -170,8 +179,9 @@ Result<void> ContainerBuilder::giveAway(const Made& made, const char* subdirecto
 }
 
 Result<void> ContainerBuilder::giveAway() {
+    const Modes modes = modesOfSubdirectories();
     for (std::size_t i = subdirectories_.size(); i-- > 0;)
-        TRY(giveAway(subdirectories_[i], layout_.subdirectories[i]));
+        TRY(giveAway(subdirectories_[i], layout_.subdirectories[i], modes));
     const std::uint32_t owner = layout_.topLevelOwner;
     Errno error = owner == ownerUnchanged ? Errno() : disk_.changeOwner(directory_.get(), owner, owner);
     const char* verb = "chown";
