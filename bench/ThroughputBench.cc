@@ -123,7 +123,7 @@ std::vector<Figure> figuresOf(int count, const Blocks& measured, const Blocks& f
          .value = pairs.ratio(),
          .unit = "x",
          .sense = Sense::atLeast,
-         .goal = 0.5,
+         .goal = 0.55,
          .remark = text("processor time of each %.1f us, of the floor %.1f us", each, floorEach),
          .numbers = {{"perSecond", pairs.measuredMedian()},
                      {"floorPerSecond", pairs.floorMedian()},

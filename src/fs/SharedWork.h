@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// Work that several threads share: numbered things, or the directories of a tree.
+// Work that several threads share: numbered things, things as they are found, or the directories of a tree.
 //
 // Threads come to the caller's own where that pays, and have ended when a call returns; one that is not to be had is
 // not missed. A thread serves the caller at the caller's priority, or at the usual one where the caller's is higher. An
@@ -15,6 +15,7 @@
 #include <functional>
 #include <string>
 #include <thread>
+#include <utility>
 #include <vector>
 
 namespace zor::fs {
@@ -47,6 +48,87 @@ private:
 /// Calls `work(begin, end)` for stretches that together are 0 to `count`, each once: on this thread, on a second one
 /// where there are many, and on more for as long as the threads wait for a disk, which serves several at once.
 void forEachStretch(std::size_t count, const std::function<void(std::size_t begin, std::size_t end)>& work);
+
+/// Things that one thread finds, in order, and that it shares the work on with a second one: that one comes when there
+/// have been many, takes them a batch at a time, and where it has enough to do the finder does its batch itself. So no
+/// more than three batches are held. Both call `work`, at once; nothing is done in the order in which it was found.
+template <typename Thing>
+class HandedOn {
+public:
+    using Work = std::function<void(Thing&)>;
+    /// Things of one batch: few enough for one descriptor each, many enough to be worth a wake-up.
+    static constexpr std::size_t batchCount = 16;
+    static constexpr std::size_t countForTwoThreads = 256;
+
+    explicit HandedOn(Work work) : work_(std::move(work)) { mine_.reserve(batchCount); }
+    HandedOn(const HandedOn&) = delete;
+    HandedOn& operator=(const HandedOn&) = delete;
+    /// After an exception what was not begun stays undone.
+    ~HandedOn() { end(); }
+
+    void add(Thing thing) {
+        mine_.push_back(std::move(thing));
+        if (mine_.size() < batchCount)
+            return;
+        if (++batches_ == countForTwoThreads / batchCount)
+            helpers_.add(help_);
+        if (!handOver())
+            workOff(mine_);
+    }
+    /// Returns when all is done; throws what one of the calls of `work` threw.
+    void finish() {
+        workOff(mine_);
+        end();
+        helpers_.finish();
+    }
+
+private:
+    bool handOver() ZOR_EXCLUDES(mutex_) {
+        const platform::MutexLock held(mutex_);
+        if (!isHelped_ || !theirs_.empty())
+            return false;
+        theirs_.swap(mine_);
+        changed_.signal();
+        return true;
+    }
+    void help() ZOR_EXCLUDES(mutex_) {
+        std::vector<Thing> batch;
+        batch.reserve(batchCount);
+        for (;;) {
+            {
+                const platform::MutexLock held(mutex_);
+                isHelped_ = true;
+                while (theirs_.empty() && !ended_)
+                    changed_.wait(mutex_);
+                if (theirs_.empty())
+                    return;
+                batch.swap(theirs_);
+            }
+            workOff(batch);
+        }
+    }
+    void workOff(std::vector<Thing>& batch) {
+        for (Thing& thing : batch)
+            work_(thing);
+        batch.clear();
+    }
+    void end() ZOR_EXCLUDES(mutex_) {
+        const platform::MutexLock held(mutex_);
+        ended_ = true;
+        changed_.signal();
+    }
+
+    const Work work_;
+    const std::function<void()> help_ = [this] { help(); };
+    std::size_t batches_ = 0;
+    std::vector<Thing> mine_;
+    platform::Mutex mutex_;
+    platform::ConditionVariable changed_;
+    std::vector<Thing> theirs_ ZOR_GUARDED_BY(mutex_);
+    bool isHelped_ ZOR_GUARDED_BY(mutex_) = false;
+    bool ended_ ZOR_GUARDED_BY(mutex_) = false;
+    Helpers helpers_{1}; // ends before what it works on
+};
 
 /// The directories of a tree that wait for one of the threads that share a walk of it, as paths relative to its root,
 /// which is "" and waits first. Bounded in number and in memory. Any thread.

@@ -322,28 +322,38 @@ Result<void> ZORFileManager::setDataProtectionClassOfItemAtURL(const FileURL& ur
     return setClassOf(item->get(), url.path(), protectionClass, predicate);
 }
 
-Result<void> ZORFileManager::setDataProtectionClassOfEntry(
-    const fs::WalkEntry& entry, const std::string& path, int protectionClass,
-    const std::function<bool(const struct stat& status, int current)>& predicate) {
-    if (entry.directory >= 0)
-        return setClassOf(entry.directory, path, protectionClass,
-                          [&](int current) { return predicate(entry.status, current); });
+Result<std::optional<FileDescriptor>> ZORFileManager::openForDataProtection(const fs::WalkEntry& entry,
+                                                                            const std::string& path) const {
     auto item = openBeneathOnMount(entry.parent, entry.name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
     // Its class is beside its content, which alone is encrypted, or under a lease of its owner's that an open would
     // wait for: it needs no open.
     if (!item && (item.error() == ENOKEY || item.error() == EWOULDBLOCK))
         item = openBeneathOnMount(entry.parent, entry.name, O_PATH | O_NOFOLLOW);
+    if (item)
+        return std::optional(std::move(*item));
     // Gone, a link, something without a reader, or the place of a mount.
-    if (!item && (item.error() == ENOENT || item.error() == ELOOP || item.error() == ENXIO || item.error() == EXDEV))
-        return {};
+    if (item.error() == ENOENT || item.error() == ELOOP || item.error() == ENXIO || item.error() == EXDEV)
+        return std::optional<FileDescriptor>();
+    const Errno number = platform::neverLocked(item.error());
+    return posixError(ZOR_HERE, number, "Failed to open %s : %s", ZOR_SHOWN(path), number.text());
+}
+
+Result<void> ZORFileManager::setDataProtectionClassOfFile(int file, const std::string& path, int protectionClass,
+                                                          const StatusPredicate& predicate) {
     struct stat status{};
-    if (!item || ::fstat(item->get(), &status) != 0) {
-        const Errno number = platform::neverLocked(item ? Errno::last() : item.error());
+    if (::fstat(file, &status) != 0) {
+        const Errno number = platform::neverLocked(Errno::last());
         return posixError(ZOR_HERE, number, "Failed to open %s : %s", ZOR_SHOWN(path), number.text());
     }
     if (!S_ISREG(status.st_mode))
         return {};
-    return setClassOf(item->get(), path, protectionClass, [&](int current) { return predicate(status, current); });
+    return setClassOf(file, path, protectionClass, [&](int current) { return predicate(status, current); });
+}
+
+Result<void> ZORFileManager::setDataProtectionClassOfDirectory(const fs::WalkEntry& entry, const std::string& path,
+                                                               int protectionClass, const StatusPredicate& predicate) {
+    return setClassOf(entry.directory, path, protectionClass,
+                      [&](int current) { return predicate(entry.status, current); });
 }
 
 Result<void> ZORFileManager::setClassOf(int fd, const std::string& path, int protectionClass,

@@ -4,6 +4,7 @@
 #include "base/Assert.h"
 #include "base/BlockingScope.h"
 
+#include <atomic>
 #include <cerrno>
 #include <chrono>
 #include <fcntl.h>
@@ -44,6 +45,29 @@ std::optional<DirectoryIdentity> identityOf(int directory) {
                              .birthSeconds = status.stx_btime.tv_sec,
                              .birthNanoseconds = status.stx_btime.tv_nsec};
 }
+
+/// The first failure of a walk, on whichever thread. Any thread.
+class FirstFailure {
+public:
+    void note(Result<void> done) {
+        if (done)
+            return;
+        const platform::MutexLock held(mutex_);
+        if (!error_)
+            error_ = std::move(done).error();
+        is_ = true;
+    }
+    [[nodiscard]] bool is() const { return is_; }
+    Result<void> take() {
+        const platform::MutexLock held(mutex_);
+        return error_ ? Result<void>(std::move(*error_)) : Result<void>();
+    }
+
+private:
+    std::atomic<bool> is_{false};
+    platform::Mutex mutex_;
+    std::optional<ZORError> error_ ZOR_GUARDED_BY(mutex_);
+};
 
 } // namespace
 
@@ -197,29 +221,36 @@ Result<platform::FileDescriptor> ZORDataProtectionChangeOperation::openContainer
 }
 
 Result<void> ZORDataProtectionChangeOperation::walk(int container, const std::vector<Item>& items) {
-    namesMet_.forgetAll();
-    foreignFiles_ = 0;
-    std::optional<ZORError> failure;
+    {
+        const platform::MutexLock held(sharedMutex_);
+        namesMet_.forgetAll();
+        foreignFiles_ = 0;
+    }
+    FirstFailure failure;
+    OpenFiles files([&](const OpenFile& file) {
+        if (!failure.is())
+            failure.note(changeFile(file));
+    });
     for (const Item& item : items) {
         fs::TreeWalker walker(fs::WalkStatus::typeOnly);
         const Errno status = walker.walk(container, item.name.c_str(), [&](const WalkEntry& entry) {
-            if (auto visited = visit(entry, item); !visited) {
-                failure = std::move(visited).error();
-                return WalkStep::stop;
-            }
-            return WalkStep::proceed;
+            failure.note(visit(entry, item, files));
+            return failure.is() ? WalkStep::stop : WalkStep::proceed;
         });
-        if (failure)
-            return *failure;
+        if (failure.is())
+            break;
         if (status)
             needs_.log.write(logLevelError, passFunction, "FTS returned error for %s : %s", item.path.c_str(),
                              status.text());
     }
+    files.finish();
+    TRY(failure.take());
     saySharedFiles();
     return {};
 }
 
-void ZORDataProtectionChangeOperation::saySharedFiles() const {
+void ZORDataProtectionChangeOperation::saySharedFiles() {
+    const platform::MutexLock held(sharedMutex_);
     const std::uint64_t left = namesMet_.unfinished() + foreignFiles_;
     if (left > 0)
         needs_.log.write(logLevelNotice, passFunction,
@@ -228,7 +259,7 @@ void ZORDataProtectionChangeOperation::saySharedFiles() const {
                          static_cast<unsigned long long>(left), dataContainerMetadata_->url().c_str());
 }
 
-Result<void> ZORDataProtectionChangeOperation::visit(const WalkEntry& entry, const Item& item) {
+Result<void> ZORDataProtectionChangeOperation::visit(const WalkEntry& entry, const Item& item, OpenFiles& files) {
     if (entry.onOtherFileSystem)
         return {};
     const auto path = [&] { return entry.depth == 0 ? item.path : item.path + '/' + entry.path(); };
@@ -239,8 +270,14 @@ Result<void> ZORDataProtectionChangeOperation::visit(const WalkEntry& entry, con
         return {};
     case WalkEntryKind::directoryEnd:
         return (operationType_ & protectionChange::directories) != 0 ? changeDirectory(entry, path()) : Result<void>();
-    case WalkEntryKind::file:
-        return (operationType_ & protectionChange::files) != 0 ? changeFile(entry, path()) : Result<void>();
+    case WalkEntryKind::file: {
+        if ((operationType_ & protectionChange::files) == 0)
+            return {};
+        std::string name = path();
+        if (auto opened = TRY(needs_.fileManager.openForDataProtection(entry, name)))
+            files.add({.descriptor = std::move(*opened), .path = std::move(name)});
+        return {};
+    }
     case WalkEntryKind::unreadableDirectory:
     case WalkEntryKind::noStatus:
         break;
@@ -251,45 +288,57 @@ Result<void> ZORDataProtectionChangeOperation::visit(const WalkEntry& entry, con
 }
 
 Result<void> ZORDataProtectionChangeOperation::changeDirectory(const WalkEntry& entry, const std::string& path) {
-    return setClass(entry, path, newDataProtectionClass_,
-                    [](const struct stat&, int current) { return current == untouchableClass; });
+    return setClass(
+        path, newDataProtectionClass_, [](const struct stat&, int current) { return current == untouchableClass; },
+        [&](const Declines& predicate) {
+            return needs_.fileManager.setDataProtectionClassOfDirectory(entry, path, newDataProtectionClass_,
+                                                                        predicate);
+        });
 }
 
-Result<void> ZORDataProtectionChangeOperation::changeFile(const WalkEntry& entry, const std::string& path) {
+Result<void> ZORDataProtectionChangeOperation::changeFile(const OpenFile& file) {
     const std::int32_t target = newDataProtectionClass_ == 0 ? classOfFilesForNone : newDataProtectionClass_;
     const bool keepLower = (operationType_ & protectionChange::keepLower) != 0;
-    return setClass(entry, path, target, [this, target, keepLower](const struct stat& status, int current) {
-        if (isShared(status))
-            return true;
-        return current == target || current == untouchableClass || (keepLower && target > current);
-    });
+    return setClass(
+        file.path, target,
+        [this, target, keepLower](const struct stat& status, int current) {
+            if (isShared(status))
+                return true;
+            return current == target || current == untouchableClass || (keepLower && target > current);
+        },
+        [&](const Declines& predicate) {
+            return needs_.fileManager.setDataProtectionClassOfFile(file.descriptor.get(), file.path, target, predicate);
+        });
 }
 
-Result<void> ZORDataProtectionChangeOperation::setClass(const WalkEntry& entry, const std::string& path,
-                                                        std::int32_t target, const Declines& declines) {
+Result<void>
+ZORDataProtectionChangeOperation::setClass(const std::string& path, std::int32_t target, const Declines& declines,
+                                           const std::function<Result<void>(const Declines& predicate)>& set) {
     mode_t mode = 0;
-    auto set = needs_.fileManager.setDataProtectionClassOfEntry(
-        entry, path, target, [&](const struct stat& status, int current) {
-            mode = status.st_mode;
-            if (declines(status, current))
-                return false;
-            if (needs_.log.writes(logLevelDebug))
-                needs_.log.write(logLevelDebug, passFunction, "Setting protection class of %s to %d", ZOR_SHOWN(path),
-                                 target);
-            return true;
-        });
-    if (set || !set.error().isPosix(EBADF))
-        return set;
+    auto done = set([&](const struct stat& status, int current) {
+        mode = status.st_mode;
+        if (declines(status, current))
+            return false;
+        if (needs_.log.writes(logLevelDebug))
+            needs_.log.write(logLevelDebug, passFunction, "Setting protection class of %s to %d", ZOR_SHOWN(path),
+                             target);
+        return true;
+    });
+    if (done || !done.error().isPosix(EBADF))
+        return done;
     needs_.log.write(logLevelError, passFunction, "Ignoring failure to set protection class to %d on %s (mode 0%o): %s",
-                     target, ZOR_SHOWN(path), mode, set.error().text().c_str());
+                     target, ZOR_SHOWN(path), mode, done.error().text().c_str());
     return {};
 }
 
 bool ZORDataProtectionChangeOperation::isShared(const struct stat& status) {
+    if (status.st_uid == owner_ && status.st_nlink <= 1)
+        return false;
+    const platform::MutexLock held(sharedMutex_);
     // The container's owner can rename during the walk, so that one name is met twice; by that he reaches what is his
     // own anyway, and nothing else.
     if (status.st_uid == owner_)
-        return status.st_nlink > 1 && !namesMet_.wasLast(status);
+        return !namesMet_.wasLast(status);
     // The container's owner can move another's file in. A file that root put there with one name is the container's.
     if (status.st_nlink <= 1 && (status.st_uid == 0 || status.st_uid == ::geteuid()))
         return false;

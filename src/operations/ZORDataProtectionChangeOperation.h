@@ -12,10 +12,13 @@
 //
 // A stop in the middle leaves some files changed and nothing recorded; the same request, sent again, does the rest.
 //
-// Held by shared_ptr: a retry that waits on the lock-state queue keeps it. It runs on one thread at a time.
+// Held by shared_ptr: a retry that waits on the lock-state queue keeps it. It runs on one thread at a time, but for the
+// files of a large tree: a second thread sets the class of some that the walk has opened.
 #pragma once
 
+#include "base/Mutex.h"
 #include "base/ZORError.h"
+#include "fs/SharedWork.h"
 #include "fs/TreeWalker.h"
 #include "fs/ZORFileManager.h"
 #include "operations/Basics.h"
@@ -103,15 +106,22 @@ private:
     static std::string shown(const std::vector<Item>& items);
     Result<platform::FileDescriptor> openContainer(const std::vector<Item>& items);
     Result<void> walk(int container, const std::vector<Item>& items);
-    Result<void> visit(const fs::WalkEntry& entry, const Item& item);
+    /// A file that the walk has met: the second thread may be the one that changes it.
+    struct OpenFile {
+        platform::FileDescriptor descriptor;
+        std::string path;
+    };
+    using OpenFiles = fs::HandedOn<OpenFile>;
+    Result<void> visit(const fs::WalkEntry& entry, const Item& item, OpenFiles& files);
     Result<void> changeDirectory(const fs::WalkEntry& entry, const std::string& path);
-    Result<void> changeFile(const fs::WalkEntry& entry, const std::string& path);
-    using Declines = std::function<bool(const struct stat& status, int current)>;
-    Result<void> setClass(const fs::WalkEntry& entry, const std::string& path, std::int32_t target,
-                          const Declines& declines);
-    /// Whether a file, met under one of its names, may be somebody else's too.
-    [[nodiscard]] bool isShared(const struct stat& status);
-    void saySharedFiles() const;
+    Result<void> changeFile(const OpenFile& file) ZOR_EXCLUDES(sharedMutex_);
+    using Declines = ZORFileManager::StatusPredicate;
+    /// `set` sets the class of what it is given a predicate for.
+    Result<void> setClass(const std::string& path, std::int32_t target, const Declines& declines,
+                          const std::function<Result<void>(const Declines&)>& set);
+    /// Whether a file, met under one of its names, may be somebody else's too. Either thread.
+    [[nodiscard]] bool isShared(const struct stat& status) ZOR_EXCLUDES(sharedMutex_);
+    void saySharedFiles() ZOR_EXCLUDES(sharedMutex_);
 
     const Needs needs_;
     const std::shared_ptr<const ZORMetadata> dataContainerMetadata_;
@@ -127,8 +137,9 @@ private:
     std::optional<DirectoryIdentity> firstMet_;
     // The state of one pass.
     uid_t owner_ = 0; // the container's
-    fs::NamesMet namesMet_;
-    std::uint64_t foreignFiles_ = 0; // of another owner than the container's
+    platform::Mutex sharedMutex_;
+    fs::NamesMet namesMet_ ZOR_GUARDED_BY(sharedMutex_);
+    std::uint64_t foreignFiles_ ZOR_GUARDED_BY(sharedMutex_) = 0; // of another owner than the container's
 };
 
 } // namespace zor

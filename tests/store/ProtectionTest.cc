@@ -310,6 +310,28 @@ TEST_F(Protection, HostileOwner) {
     EXPECT_FALSE(world.exists(path + "tmp")); // an item that is missing is not made
 }
 
+// Goal: a tree that two threads share is changed to its last file, and a failure or a lock in its middle is the
+// change's. Method: many files; the disk refuses one, then the device locks.
+TEST_F(Protection, TwoThreadsShareALargeTree) {
+    constexpr int count = 1000;
+    const auto isSet = [](const support::DiskCallInfo& info) { return info.call == support::DiskCall::setAttribute; };
+    for (int i = 0; i < count; ++i)
+        world.write(path + "Documents/" + std::to_string(i), "x");
+    world.disk().arm({.point = 500, .error = EACCES, .filter = isSet});
+    EXPECT_EQ(change(to(1)), static_cast<std::uint64_t>(EACCES));
+    world.disk().arm({.filter = [&, sets = 0](const auto& info) mutable {
+        if (isSet(info) && ++sets == 200)
+            world.lockState.state = 1;
+        return false;
+    }});
+    EXPECT_EQ(change(to(1)), 61U);
+    world.disk().disarm();
+    world.lockState.state = 0;
+    EXPECT_EQ(change(to(1)), 1U);
+    for (int i = 0; i < count; ++i)
+        ASSERT_EQ(classOf(path + "Documents/" + std::to_string(i)), 1) << i;
+}
+
 // Goal: a forbidden open is the change's error; taken for a lock it would be tried again for ever. Method: a listener
 // that refuses the opens of the container, then of a file in it.
 TEST_F(Protection, AForbiddenOpenIsNoLock) {
