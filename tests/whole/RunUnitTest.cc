@@ -57,75 +57,56 @@ TEST(RunInAUnit, Settings) {
     const std::string root = launcher.daemon.root();
     const std::string home = launcher.daemon.path("private/var/mobile");
     const std::string needed = "-all,+dac_override,+sys_admin,+net_admin,+setuid,+setgid,+setpcap";
+    const std::string devices =
+        "mount -t tmpfs none /mnt && mkdir /mnt/shm /mnt/pts && for n in null zero full random urandom tty; do touch "
+        "/mnt/$n; mount --bind /dev/$n /mnt/$n; done && mount --bind /dev/shm /mnt/shm && mount --move /mnt /dev";
     const std::string etc = root + "/etc.copy";
-    const std::string link = "cp -a /etc " + etc + " && ln -sf ../run/there/resolv.conf " + etc +
-                             "/resolv.conf && mount --bind " + etc +
-                             " /etc && mount -t tmpfs none /run && mkdir "
-                             "/run/here && echo nameserver > /run/here/resolv.conf && ";
+    const std::string link = "cp -a /etc " + etc + " && mount --bind " + etc + " /etc && mount -t tmpfs none /run && " +
+                             "ln -sf ../run/there/resolv.conf /etc/resolv.conf && mkdir /run/here && "
+                             "echo nameserver > /run/here/resolv.conf && ";
+    const Words host = {"--network", "host"};
     const struct {
         const char* setting;
         Words state;
+        Words words; // the launcher's
         const char* script;
         int exitCode = 0;
         const char* says = "";
-        Words words = {};
         std::function<bool()> prepare = {};
     } rows[] = {
-        {"User=", {"/usr/bin/setpriv", "--reuid", "501", "--clear-groups"}, "true", 125, "needs root"},
-        {"SupplementaryGroups=", {"/usr/bin/setpriv", "--groups", "4"}, "test \"$(id -G)\" = 501"},
-        {"CapabilityBoundingSet=", capabilities(needed), "true"},
-        {"without CAP_SYS_ADMIN", capabilities("-sys_admin"), "true", 125, "CAP_SYS_ADMIN"},
-        {"without CAP_NET_ADMIN", capabilities("-net_admin"), "true", 125, "CAP_NET_ADMIN"},
-        {"without CAP_SETPCAP", capabilities("-setpcap"), "true", 125, "CAP_SETPCAP"},
-        {"NoNewPrivileges=", {"/usr/bin/setpriv", "--no-new-privs"}, "true"},
-        {"RestrictNamespaces=", {}, "true", 125, "cannot be made: unshare", {}, refused(SYS_unshare)},
-        {"SystemCallFilter=", {}, "true", 125, "restrict namespaces", {}, refused(SYS_mount)},
-        {"PrivateTmp=", mounts("mount -t tmpfs none /tmp"), "touch /tmp/x"},
-        {"PrivateDevices=",
-         mounts("mount -t tmpfs none /mnt && mkdir /mnt/shm /mnt/pts && for n in null zero full random urandom tty; do "
-                "touch /mnt/$n; mount --bind /dev/$n /mnt/$n; done && mount --bind /dev/shm /mnt/shm && mount --move "
-                "/mnt /dev"),
-         "head -c 1 /dev/urandom > /dev/null"},
-        {"ProtectHome=", mounts("mount -t tmpfs none " + home), "true", 125, "the mount namespace of this process"},
-        {"ProtectSystem=full", mounts("mount --bind /usr /usr && mount -o remount,ro,bind /usr"), "touch $HOME/x"},
-        {"ProtectSystem=strict", mounts("mount --bind " + root + " " + root + " && mount -o remount,ro,bind " + root),
-         "true", 125, "read-only"},
-        {"ProcSubset=pid", mounts("mount -t proc -o subset=pid proc /proc"), "true", 125, "said why above"},
-        {"ProtectProc=", mounts("mount -t proc -o hidepid=invisible proc /proc"), "test -e /proc/stat"},
-        {"PrivateNetwork=",
-         {"/usr/bin/unshare", "-n"},
-         "test $(grep -c : /proc/net/dev) = 1",
-         0,
-         "",
-         {"--network", "host"}},
-        {"PrivateIPC=", {"/usr/bin/unshare", "-i", "-u"}, "true"},
-        {"UMask=", {"/bin/sh", "-c", "umask 077; exec \"$@\"", "sh"}, "test $(umask) = 0022"},
-        {"WorkingDirectory=",
-         {"/usr/bin/env", "-C", "/usr"},
-         "test \"$(pwd)\" = \"$HOME\" && test \"$PWD\" = \"$HOME\""},
-        {"Environment=",
-         {"/usr/bin/env", "DEBUG=1"},
-         "test -z \"$DEBUG\" && test \"$A $LANG\" = 'b=c d'",
-         0,
-         "",
-         {"--setenv", "A=b=c", "--setenv", "LANG=d"}},
-        {"LimitNOFILE=", {"/usr/bin/prlimit", "--nofile=64"}, "test $(ulimit -n) = 64"},
-        {"Nice=", {"/usr/bin/nice", "-n", "3"}, "test $(nice) = 3"},
-        {"OOMScoreAdjust=", {"/usr/bin/choom", "-n", "7", "--"}, "test $(cat /proc/self/oom_score_adj) = 7"},
-        {"resolv.conf",
-         mounts(link + "mv /run/here /run/there"),
-         "grep -q nameserver /etc/resolv.conf && ! echo > /etc/resolv.conf && test \"$(find /run -type f)\" = "
-         "/run/there/resolv.conf",
-         0,
-         "",
-         {"--network", "host"}},
-        {"resolv.conf behind a link",
-         mounts(link + "ln -s here /run/there"),
-         "! cat /etc/resolv.conf",
-         0,
-         "",
-         {"--network", "host"}},
-        {"resolv.conf without a network", mounts(link + "mv /run/here /run/there"), "! cat /etc/resolv.conf"},
+        {"User=", {"/usr/bin/setpriv", "--reuid", "501", "--clear-groups"}, {}, "true", 125, "needs root"},
+        {"SupplementaryGroups=", {"/usr/bin/setpriv", "--groups", "4"}, {}, "test \"$(id -G)\" = 501"},
+        {"CapabilityBoundingSet=", capabilities(needed), {}, "true"},
+        {"without CAP_SYS_ADMIN", capabilities("-sys_admin"), {}, "true", 125, "CAP_SYS_ADMIN"},
+        {"without CAP_NET_ADMIN", capabilities("-net_admin"), {}, "true", 125, "CAP_NET_ADMIN"},
+        {"NoNewPrivileges=", {"/usr/bin/setpriv", "--no-new-privs"}, {}, "true"},
+        {"RestrictNamespaces=", {}, {}, "true", 125, "cannot be made: unshare", refused(SYS_unshare)},
+        {"SystemCallFilter=", {}, {}, "true", 125, "restrict namespaces", refused(SYS_mount)},
+        {"PrivateTmp=", mounts("mount -t tmpfs none /tmp"), {}, "touch /tmp/x"},
+        {"PrivateDevices=", mounts(devices), {}, "head -c 1 /dev/urandom > /dev/null"},
+        {"ProtectHome=", mounts("mount -t tmpfs none " + home), {}, "true", 125, "the mount namespace of this process"},
+        {"ProtectSystem=full", mounts("mount --bind /usr /usr && mount -o remount,ro,bind /usr"), {}, "touch $HOME/x"},
+        {"ProtectSystem=strict",
+         mounts("mount --bind " + root + " " + root + " && mount -o remount,ro,bind " + root),
+         {},
+         "true",
+         125,
+         "read-only"},
+        {"ProcSubset=pid", mounts("mount -t proc -o subset=pid proc /proc"), {}, "true", 125, "said why above"},
+        {"ProtectProc=", mounts("mount -t proc -o hidepid=invisible proc /proc"), {}, "test -e /proc/stat"},
+        {"PrivateNetwork=", {"/usr/bin/unshare", "-n"}, host, "test $(grep -c : /proc/net/dev) = 1"},
+        {"PrivateIPC=", {"/usr/bin/unshare", "-i", "-u"}, {}, "true"},
+        {"UMask=", {"/bin/sh", "-c", "umask 077; exec \"$@\"", "sh"}, {}, "test $(umask) = 0022"},
+        {"WorkingDirectory=", {"/usr/bin/env", "-C", "/usr"}, {}, "test \"$(pwd) $PWD\" = \"$HOME $HOME\""},
+        {"Environment=", {"/usr/bin/env", "A=1", "B=1"}, {"--setenv", "A=b=c"}, "test \"$A $B\" = 'b=c '"},
+        {"LimitNOFILE=", {"/usr/bin/prlimit", "--nofile=64"}, {}, "test $(ulimit -n) = 64"},
+        {"Nice=", {"/usr/bin/nice", "-n", "3"}, {}, "test $(nice) = 3"},
+        {"OOMScoreAdjust=", {"/usr/bin/choom", "-n", "7", "--"}, {}, "test $(cat /proc/self/oom_score_adj) = 7"},
+        {"resolv.conf", mounts(link + "mv /run/here /run/there"), host,
+         "grep -q name /etc/resolv.conf && ! echo > /etc/resolv.conf && test \"$(find /run -type f)\" = "
+         "/run/there/resolv.conf"},
+        {"resolv.conf behind a link", mounts(link + "ln -s here /run/there"), host, "! cat /etc/resolv.conf"},
+        {"resolv.conf without a network", mounts(link + "mv /run/here /run/there"), {}, "! cat /etc/resolv.conf"},
     };
     for (const auto& row : rows) {
         SCOPED_TRACE(row.setting);
@@ -171,10 +152,8 @@ TEST(RunInAUnit, Descriptors) {
     } rows[] = {
         {"a directory", ::open("/etc", O_RDONLY), {125, 125, 125, 125}},
         {"a place", ::open("/etc", O_PATH), {125, 125, 125, 125}},
-        {"a pipe's place", ::open(fifo.c_str(), O_PATH), {125, 125, 125, 125}},
         {"an epoll", ::epoll_create1(0), {125, 125, 125, 125}},
         {"datagrams", socketOf(AF_UNIX, SOCK_DGRAM), {125, 125, 0, 0}},
-        {"connected datagrams", socketOf(AF_UNIX, SOCK_DGRAM, true), {125, 125, 0, 0}},
         {"a socket of no peer", socketOf(AF_UNIX, SOCK_STREAM), {125, 125, 0, 0}},
         {"a socket of the network", socketOf(AF_INET, SOCK_STREAM), {125, 125, 0, 0}},
         {"a packet socket", socketOf(AF_PACKET, SOCK_RAW), {125, 125, 0, 125}},
