@@ -99,12 +99,16 @@ bool Log::writes(int level) const {
 void Log::write(int level, const char* function, const char* format, ...) const noexcept {
     std::va_list arguments;
     va_start(arguments, format);
+    writeList(level, function, format, arguments);
+    va_end(arguments);
+}
+
+void Log::writeList(int level, const char* function, const char* format, std::va_list arguments) const noexcept {
     try {
         writeText(level, function, formattedList(format, arguments));
     } catch (...) {
         linesLost_.fetch_add(1, std::memory_order_relaxed);
     }
-    va_end(arguments);
 }
 
 void Log::writeText(int level, const char* function, std::string_view message) const noexcept {

@@ -15,6 +15,7 @@
 #include "platform/Process.h"
 
 #include <atomic>
+#include <cstdarg>
 #include <cstdint>
 #include <functional>
 #include <optional>
@@ -82,6 +83,8 @@ public:
     [[nodiscard]] bool writes(int level) const;
     void write(int level, const char* function, const char* format, ...) const noexcept
         __attribute__((format(printf, 4, 5)));
+    void writeList(int level, const char* function, const char* format, std::va_list arguments) const noexcept
+        __attribute__((format(printf, 4, 0)));
     void writeText(int level, const char* function, std::string_view message) const noexcept;
 
     /// Lines that were lost here for want of memory, since the start.

@@ -96,16 +96,45 @@ void logError(const Log& log, const ZORError& error) {
         log.write(logLevelError, error.functionName(), "%d: %s", error.sourceFileLine(), error.description()->c_str());
 }
 
-ZORError makeError(const Log& log, Here here, ErrorCode code, const ZORError* underlying, LogFlag flag,
-                   const char* format, ...) {
+ZORError Reporter::make(CodeOfLine code, const ZORError* cause, const char* format, std::va_list arguments) const {
+    return {{function_, code.line},
+            ErrorDomain::zor,
+            static_cast<int>(code.code),
+            formattedList(format, arguments),
+            cause ? std::make_shared<const ZORError>(*cause) : nullptr};
+}
+
+ZORError Reporter::error(CodeOfLine code, const char* format, ...) const {
     std::va_list arguments;
     va_start(arguments, format);
-    ZORError error(here, ErrorDomain::zor, static_cast<int>(code), formattedList(format, arguments),
-                   underlying ? std::make_shared<const ZORError>(*underlying) : nullptr);
+    ZORError made = make(code, nullptr, format, arguments);
     va_end(arguments);
-    if (flag == LogFlag::yes)
-        logError(log, error);
-    return error;
+    logError(log_, made);
+    return made;
+}
+
+ZORError Reporter::error(CodeOfLine code, const ZORError* cause, const char* format, ...) const {
+    std::va_list arguments;
+    va_start(arguments, format);
+    ZORError made = make(code, cause, format, arguments);
+    va_end(arguments);
+    logError(log_, made);
+    return made;
+}
+
+ZORError Reporter::unlogged(CodeOfLine code, const char* format, ...) const {
+    std::va_list arguments;
+    va_start(arguments, format);
+    ZORError made = make(code, nullptr, format, arguments);
+    va_end(arguments);
+    return made;
+}
+
+void Reporter::write(int level, const char* format, ...) const noexcept {
+    std::va_list arguments;
+    va_start(arguments, format);
+    log_.writeList(level, function_, format, arguments);
+    va_end(arguments);
 }
 
 ZORError posixError(Here here, Errno error, const char* format, ...) {
@@ -154,8 +183,9 @@ ZORException::ZORException(std::string name, std::string reason)
       callStack_(callStackSymbols()) {}
 
 ZORError ExceptionBoundary::caught(Here here, const std::exception& exception) {
-    ZORError error = makeError(log_, here, ErrorCode::exceptionCaught, nullptr, LogFlag::yes, "Got exception: %s : %s",
-                               exception.what(), joined(stackOf(exception), ", ").c_str());
+    ZORError error = Reporter(log_, here.function)
+                         .error({ErrorCode::exceptionCaught, here.line}, "Got exception: %s : %s", exception.what(),
+                                joined(stackOf(exception), ", ").c_str());
     if (internalBuild_.isInternalBuild())
         reportFatal(exception);
     return error;

@@ -12,6 +12,7 @@
 #include "platform/Device.h"
 #include "platform/Errno.h"
 
+#include <cstdarg>
 #include <cstdint>
 #include <exception>
 #include <expected>
@@ -68,12 +69,36 @@ private:
     std::shared_ptr<const ZORError> underlying_;
 };
 
-enum class LogFlag { no, yes };
+/// A code, and the line that gives it.
+struct CodeOfLine {
+    ErrorCode code;
+    int line;
+    CodeOfLine(ErrorCode given, int at = __builtin_LINE()) : code(given), line(at) {}
+};
 
-/// An error of ZORErrorDomain. With LogFlag::yes exactly one level-3 line is written, here and nowhere else.
-/// `underlying` is copied; nullptr when there is no cause.
-ZORError makeError(const Log& log, Here here, ErrorCode code, const ZORError* underlying, LogFlag flag,
-                   const char* format, ...) __attribute__((format(printf, 6, 7)));
+/// Says what went wrong in one operation, under its name: makes its errors and writes its lines. A value; any thread.
+class Reporter {
+public:
+    /// `function` lives for ever.
+    Reporter(const Log& log, const char* function) : log_(log), function_(function) {}
+
+    /// An error of ZORErrorDomain. Exactly one level-3 line is written, here and nowhere else.
+    ZORError error(CodeOfLine code, const char* format, ...) const __attribute__((format(printf, 3, 4)));
+    /// The same, with a copy of its cause; nullptr: there is none.
+    ZORError error(CodeOfLine code, const ZORError* cause, const char* format, ...) const
+        __attribute__((format(printf, 4, 5)));
+    /// One that a healthy device comes to all the time: whoever minds writes the line (logError).
+    [[nodiscard]] ZORError unlogged(CodeOfLine code, const char* format, ...) const
+        __attribute__((format(printf, 3, 4)));
+    void write(int level, const char* format, ...) const noexcept __attribute__((format(printf, 3, 4)));
+
+private:
+    [[nodiscard]] ZORError make(CodeOfLine code, const ZORError* cause, const char* format,
+                                std::va_list arguments) const __attribute__((format(printf, 4, 0)));
+
+    const Log& log_;
+    const char* const function_;
+};
 
 /// An error of the POSIX domain; never logs.
 ZORError posixError(Here here, Errno error, const char* format, ...) __attribute__((format(printf, 3, 4)));

@@ -19,24 +19,23 @@ constexpr LogSize logSize{1, 102'400};
 } // namespace
 
 int Daemon::run() {
+    const Reporter report(composition_.log(), "main");
     const platform::Platform& platform = composition_.platform();
     auto startUp = platform.transactions.hold();
     openLog();
     if (!startQueues()) {
-        composition_.log().write(logLevelError, "main", "Can't create dispatch queues. Exiting.");
+        report.write(logLevelError, "Can't create dispatch queues. Exiting.");
         return -1;
     }
     setUp();
     if (composition_.store().setup.stopped()) {
-        composition_.log().write(logLevelNotice, "main",
-                                 "Told to end before the setup was done; the next start goes on");
+        report.write(logLevelNotice, "Told to end before the setup was done; the next start goes on");
         return 0;
     }
     followLockState();
     evaluateLockState();
     if (!startUpcallServer()) {
-        composition_.log().write(logLevelError, "main",
-                                 "Failed to initialize kernel upcall interface. THIS IS BAD! Exiting.");
+        report.write(logLevelError, "Failed to initialize kernel upcall interface. THIS IS BAD! Exiting.");
         return -1;
     }
     startUp.reset();
@@ -67,23 +66,24 @@ bool Daemon::startQueues() {
 }
 
 void Daemon::setUp() {
-    const platform::Platform& platform = composition_.platform();
     const Log& log = composition_.log();
+    const Reporter report(log, "main");
+    const platform::Platform& platform = composition_.platform();
     const auto& client = composition_.sharedClientConnection();
     SetupReport& setup = composition_.store().setup;
     setup.setSurroundings({.progress = options_.settingUp, .stopWanted = options_.stopWanted});
     if (options_.containersPerUser)
         composition_.store().limits.containersMaxPerUser = *options_.containersPerUser;
     if (const auto homeWasOpen = composition_.configuration().closeHomeDirectory(); !homeWasOpen)
-        log.write(logLevelError, "main", "%s", homeWasOpen.error().text().c_str());
+        report.write(logLevelError, "%s", homeWasOpen.error().text().c_str());
     else if (*homeWasOpen)
-        log.write(logLevelNotice, "main", "Closed the daemon's home directory, which others could read");
+        report.write(logLevelNotice, "Closed the daemon's home directory, which others could read");
     const platform::BootMarker::State marker = platform.bootMarker.look();
     if (marker.foreign)
-        log.write(logLevelError, "main", "Semaphore %s belongs to somebody else; it counts as absent",
-                  platform.bootMarker.name().c_str());
+        report.write(logLevelError, "Semaphore %s belongs to somebody else; it counts as absent",
+                     platform.bootMarker.name().c_str());
     if (!marker.present) {
-        log.write(logLevelNotice, "main", "zorvaned performing first boot initialization");
+        report.write(logLevelNotice, "zorvaned performing first boot initialization");
         client->rebootContainerManagerSetup();
         if (const Errno failure = setup.stopped() ? Errno() : platform.bootMarker.make())
             log.write(logLevelError, "set_first_boot_work_completed", "Failed to create semaphore %s: %s",
@@ -120,17 +120,16 @@ void Daemon::evaluateLockState() {
 
 bool Daemon::startUpcallServer() {
     const platform::Platform& platform = composition_.platform();
-    const Log& log = composition_.log();
-    constexpr const char* function = "ZORKernServerStart";
+    const Reporter report(composition_.log(), "ZORKernServerStart");
     if (const Errno failure = platform.upcallPort.checkIn()) {
-        log.write(logLevelError, function, "%s: %s", platform.upcallPort.checkInCallName(), failure.text());
+        report.write(logLevelError, "%s: %s", platform.upcallPort.checkInCallName(), failure.text());
         return false;
     }
     UpcallServer& server = composition_.upcallServer();
     const bool serving = platform.upcallPort.serve(
         platform.runLoop, [&server](const platform::UpcallPacket& packet) { return server.answer(packet); });
     if (!serving)
-        log.write(logLevelError, function, "%s failed", platform.upcallPort.sourceCallName());
+        report.write(logLevelError, "%s failed", platform.upcallPort.sourceCallName());
     return serving;
 }
 

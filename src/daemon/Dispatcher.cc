@@ -51,9 +51,10 @@ bool identifiersAreUsable(CommandContext& context) {
             (!array || std::ranges::all_of(*array, isIdentifierOrNoString, [](const plist::Value& v) { return &v; })))
             continue;
         const std::string shown(key);
-        context.error = makeError(context.log, {handlerName, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                                  "Can't act on an invalid object: %s is longer than the %zu bytes of an identifier",
-                                  shown.c_str(), ipc::identifierBytesMax)
+        context.error = Reporter(context.log, handlerName)
+                            .error(ErrorCode::invalidObject,
+                                   "Can't act on an invalid object: %s is longer than the %zu bytes of an identifier",
+                                   shown.c_str(), ipc::identifierBytesMax)
                             .replyCode();
         return false;
     }
@@ -94,16 +95,16 @@ void Dispatcher::ZORProcessIpsiEvent(platform::PeerConnection& connection, platf
 }
 
 bool Dispatcher::serve(platform::PeerConnection& connection, platform::ServiceEvent& event) {
+    const Reporter report(log_, handlerName);
     ErrorCode error = ErrorCode::success;
     const std::uint64_t command = event.request.unsignedInteger(ipc::keys::command).value_or(0);
     if (command >= commandTable.size()) {
-        log_.write(logLevelError, handlerName, "Invalid command index: %lld", static_cast<long long>(command));
+        report.write(logLevelError, "Invalid command index: %lld", static_cast<long long>(command));
         return false;
     }
     const ZORCommandTableRow& row = commandTable[command];
     if (static_cast<std::uint64_t>(row.command) != command) {
-        log_.write(logLevelError, handlerName, "Invalid command at index %llu",
-                   static_cast<unsigned long long>(command));
+        report.write(logLevelError, "Invalid command at index %llu", static_cast<unsigned long long>(command));
         return false;
     }
     platform::Identity identity = connection.peer().identify(platform::Peer::Explain::no);
@@ -114,7 +115,7 @@ bool Dispatcher::serve(platform::PeerConnection& connection, platform::ServiceEv
     if (!client)
         return false;
     if (!event.reply) {
-        log_.write(logLevelError, handlerName, "Dictionary does not have reply context");
+        report.write(logLevelError, "Dictionary does not have reply context");
         return false;
     }
     plist::Dictionary reply;

@@ -57,35 +57,33 @@ Result<void> ZORFileManager::removeItemAtURL(const std::optional<FileURL>& url) 
 Result<void> ZORFileManager::removeItemIn(int directory, const FileURL& url,
                                           const std::function<bool(int directory)>& isMeant) {
     Errno firstError;
-    static constexpr const char* function = "removeItemAtURL";
+    const Reporter report(log_, "removeItemAtURL");
     fs::RemoveCallbacks callbacks;
     callbacks.isMeant = isMeant;
     callbacks.directoryMadeMutable = [&](const std::string& path) {
-        log_.write(logLevelNotice, function, "Unset UF_IMMUTABLE on %s", ZOR_SHOWN(below(url, path)));
+        report.write(logLevelNotice, "Unset UF_IMMUTABLE on %s", ZOR_SHOWN(below(url, path)));
     };
     callbacks.failed = [&](const fs::RemoveFailure& failure) {
         const std::string path = below(url, failure.path);
         if (failure.error != ENOENT)
-            log_.write(logLevelError, function, "prunetree hit error for %s : %s", ZOR_SHOWN(path),
-                       failure.error.text());
+            report.write(logLevelError, "prunetree hit error for %s : %s", ZOR_SHOWN(path), failure.error.text());
         struct stat status{};
         const Errno unexamined =
             failure.error == EPERM ? fs::statusOfName(failure.parent, failure.name, status) : failure.error;
         const bool examined = !unexamined;
         if (failure.error == EPERM && !examined)
-            log_.write(logLevelError, function, "Failed to stat %s before unsetting UF_IMMUTABLE: %s", ZOR_SHOWN(path),
-                       unexamined.text());
+            report.write(logLevelError, "Failed to stat %s before unsetting UF_IMMUTABLE: %s", ZOR_SHOWN(path),
+                         unexamined.text());
         if (examined) {
             const auto cleared = fs::clearImmutable(disk_, failure.parent, failure.name);
             if (!cleared)
-                log_.write(logLevelError, function, "Failed to lchflags %s: %s", ZOR_SHOWN(path),
-                           cleared.error().text());
+                report.write(logLevelError, "Failed to lchflags %s: %s", ZOR_SHOWN(path), cleared.error().text());
             if (cleared.value_or(false)) {
-                log_.write(logLevelNotice, function, "Unset UF_IMMUTABLE on %s", ZOR_SHOWN(path));
+                report.write(logLevelNotice, "Unset UF_IMMUTABLE on %s", ZOR_SHOWN(path));
                 const Errno removed = disk_.unlinkFile(failure.parent, failure.name);
                 if (!removed)
                     return;
-                log_.write(logLevelError, function, "unlink of %s failed: %s", ZOR_SHOWN(path), removed.text());
+                report.write(logLevelError, "unlink of %s failed: %s", ZOR_SHOWN(path), removed.text());
             }
         }
         if (!firstError)
@@ -249,10 +247,10 @@ Result<void> ZORFileManager::_traverseDirectory(const FileURL& url,
 
 void ZORFileManager::standardizeEntry(int parent, const char* name, int directory, const std::string& path,
                                       Standard& standard, fs::NamesMet& namesMet) {
-    constexpr const char* function = "standardizeOwnershipAtURL";
+    const Reporter report(log_, "standardizeOwnershipAtURL");
     const auto [uid, gid, formerOwner, others] = standard;
     const auto notGiven = [&](Errno number) {
-        log_.write(logLevelError, function, "Could not chown %s: %s", ZOR_SHOWN(path), number.text());
+        report.write(logLevelError, "Could not chown %s: %s", ZOR_SHOWN(path), number.text());
     };
     platform::FileDescriptor opened;
     if (directory < 0) {
@@ -271,8 +269,8 @@ void ZORFileManager::standardizeEntry(int parent, const char* name, int director
     // The former owner can have named another's file or directory so that it lies here.
     if (daemon_ == 0 && status.st_uid != formerOwner && status.st_uid != uid) {
         if (others < othersSaidMax)
-            log_.write(logLevelError, function, "%s belongs to user %u: it keeps its owner and mode", ZOR_SHOWN(path),
-                       status.st_uid);
+            report.write(logLevelError, "%s belongs to user %u: it keeps its owner and mode", ZOR_SHOWN(path),
+                         status.st_uid);
         ++standard.others;
         return;
     }
@@ -286,7 +284,7 @@ void ZORFileManager::standardizeEntry(int parent, const char* name, int director
     if (sharedElsewhere || S_ISLNK(status.st_mode)) // Linux keeps no mode for a link
         return;
     if (const Errno changed = disk_.changeMode(item, standardMode(status.st_mode)))
-        log_.write(logLevelError, function, "Could not chmod %s: %s", ZOR_SHOWN(path), changed.text());
+        report.write(logLevelError, "Could not chmod %s: %s", ZOR_SHOWN(path), changed.text());
 }
 
 Result<void> ZORFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t uid, gid_t gid, uid_t formerOwner,
@@ -391,24 +389,24 @@ void ZORFileManager::printDirectoryStructureAtURL(const FileURL& url) {
         log_.write(logLevelError, __func__, "fts_open failed for %s : %s", url.c_str(), parent.error().text());
         return;
     }
-    constexpr const char* function = "printDirectoryStructureAtURL";
+    const Reporter report(log_, "printDirectoryStructureAtURL");
     fs::TreeWalker walker(fs::WalkStatus::typeOnly);
     const Errno status = walker.walk(parent->directory.get(), parent->name.c_str(), [&](const WalkEntry& entry) {
         const std::string path = below(url, entry.path());
         if (entry.kind == WalkEntryKind::unreadableDirectory || entry.kind == WalkEntryKind::noStatus)
-            log_.write(logLevelError, function, "FTS returned error for %s : %s", ZOR_SHOWN(path), entry.error.text());
+            report.write(logLevelError, "FTS returned error for %s : %s", ZOR_SHOWN(path), entry.error.text());
         else if (entry.kind != WalkEntryKind::directoryEnd)
-            log_.write(logLevelError, function, "\tOrphaned File: %s", ZOR_SHOWN(path));
+            report.write(logLevelError, "\tOrphaned File: %s", ZOR_SHOWN(path));
         return WalkStep::proceed;
     });
     if (status)
-        log_.write(logLevelError, function, "FTS returned error for %s : %s", url.c_str(), status.text());
+        report.write(logLevelError, "FTS returned error for %s : %s", url.c_str(), status.text());
 }
 
 std::uint64_t ZORFileManager::diskUsageForURL(const FileURL& url) {
-    constexpr const char* function = "diskUsageForURL";
+    const Reporter report(log_, "diskUsageForURL");
     if (url.empty()) {
-        log_.write(logLevelError, function, "Failed to get path to url %s", url.c_str());
+        report.write(logLevelError, "Failed to get path to url %s", url.c_str());
         return 0;
     }
     return diskUsageOfDirectory(resolver_.openDirectory(url), url).bytes;

@@ -8,10 +8,10 @@ namespace zor {
 Result<void> checkAddress(const Log& log, const char* function, const ContainerAddress& address) {
     if (address.uuid && isValidClass(address.containerClass))
         return {};
-    return makeError(log, {function, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                     "Can't act on an invalid object: userId: %u, UUID: %s, Class: %ld", address.userId,
-                     address.uuid ? address.uuid->string().c_str() : "(null)",
-                     static_cast<long>(address.containerClass));
+    return Reporter(log, function)
+        .error(ErrorCode::invalidObject, "Can't act on an invalid object: userId: %u, UUID: %s, Class: %ld",
+               address.userId, address.uuid ? address.uuid->string().c_str() : "(null)",
+               static_cast<long>(address.containerClass));
 }
 
 Result<std::shared_ptr<ZORMetadata>> knownContainer(const Log& log, ZORContainerCache& cache, const char* function,
@@ -22,9 +22,9 @@ Result<std::shared_ptr<ZORMetadata>> knownContainer(const Log& log, ZORContainer
                                              address.identifier ? &*address.identifier : nullptr, uuid));
     if (record)
         return record;
-    return makeError(log, {function, __LINE__}, ErrorCode::notFound, nullptr, LogFlag::yes,
-                     "No Container with userId: %u UUID: %s, identifier: %s, Class: %ld", address.userId, uuid.c_str(),
-                     ZOR_SHOWN(address.identifier), static_cast<long>(address.containerClass));
+    return Reporter(log, function)
+        .error(ErrorCode::notFound, "No Container with userId: %u UUID: %s, identifier: %s, Class: %ld", address.userId,
+               uuid.c_str(), ZOR_SHOWN(address.identifier), static_cast<long>(address.containerClass));
 }
 
 } // namespace zor

@@ -85,6 +85,7 @@ std::uint64_t FirstBootPasses::migrateAppGroupIdsFromDataContainersToFile() {
 }
 
 bool FirstBootPasses::migrateGroupIdentifiers(const ZORMetadata& container) {
+    const Reporter report(needs_.log, migrateFunction);
     const std::string& identifier = container.identifier();
     const plist::Value groups = *groupIdentifiersIn(container);
     const plist::Dictionary migrated{{std::string(entitlementKeys::applicationGroups), groups}};
@@ -93,8 +94,8 @@ bool FirstBootPasses::migrateGroupIdentifiers(const ZORMetadata& container) {
     // A client that registered meanwhile did so under this system: what it said stays, and the older list is added.
     const auto stored = needs_.entitlements.uniteEntitlements(identifier, migrated);
     if (!stored) {
-        needs_.log.write(logLevelError, migrateFunction, "Failed to write group id entitlements for %s to file : %s",
-                         ZOR_SHOWN(identifier), stored.error().text().c_str());
+        report.write(logLevelError, "Failed to write group id entitlements for %s to file : %s", ZOR_SHOWN(identifier),
+                     stored.error().text().c_str());
         return false;
     }
     const std::string path = container.url().path();
@@ -105,9 +106,8 @@ bool FirstBootPasses::migrateGroupIdentifiers(const ZORMetadata& container) {
                                                          .identifier = identifier,
                                                          .containerClass = container.containerClass()});
     if (!cleared)
-        needs_.log.write(logLevelError, migrateFunction, "Failed to clear group id metadata for %s at %s : %llu",
-                         ZOR_SHOWN(identifier), path.c_str(),
-                         static_cast<unsigned long long>(cleared.error().replyCode()));
+        report.write(logLevelError, "Failed to clear group id metadata for %s at %s : %llu", ZOR_SHOWN(identifier),
+                     path.c_str(), static_cast<unsigned long long>(cleared.error().replyCode()));
     return cleared.has_value();
 }
 
@@ -198,10 +198,11 @@ OrphanCleanUp::Orphan OrphanCleanUp::orphanKind(int classDirectory, const FileUR
 }
 
 void OrphanCleanUp::reportOrphan(const FileURL& entry) {
+    const Reporter report(needs_.log, function);
     for (const char* line : orphanReportHead)
-        needs_.log.write(logLevelError, function, "%s", line);
+        report.write(logLevelError, "%s", line);
     needs_.fileManager.printDirectoryStructureAtURL(entry);
-    needs_.log.write(logLevelError, function, "%s", orphanReportEnd);
+    report.write(logLevelError, "%s", orphanReportEnd);
 }
 
 std::uint64_t OrphanCleanUp::_cleanupOrphanedDataForUser(std::uint32_t userId, ContainerClass containerClass) {

@@ -81,15 +81,17 @@ private:
 
 ZORError ContainerBuilder::topLevelError(Here here, Errno error, const char* verb) {
     const ZORError cause = posixError(here, error, "%s of %s failed: %s", verb, staging_.c_str(), error.text());
-    return makeError(log_, here, ErrorCode::stagingDirectoryFailed, &cause, LogFlag::yes,
-                     "Failed to create staging dir at %s : %s", staging_.c_str(), cause.text().c_str());
+    return Reporter(log_, here.function)
+        .error({ErrorCode::stagingDirectoryFailed, here.line}, &cause, "Failed to create staging dir at %s : %s",
+               staging_.c_str(), cause.text().c_str());
 }
 
 ZORError ContainerBuilder::subdirectoryError(Here here, const char* subdirectory, Errno error, const char* verb) {
     const ZORError cause =
         posixError(here, error, "%s of %s/%s failed: %s", verb, staging_.c_str(), subdirectory, error.text());
-    return makeError(log_, here, ErrorCode::subdirectoryFailed, &cause, LogFlag::yes,
-                     "Failed to create sub-dir at %s%s", staging_.c_str(), subdirectory);
+    return Reporter(log_, here.function)
+        .error({ErrorCode::subdirectoryFailed, here.line}, &cause, "Failed to create sub-dir at %s%s", staging_.c_str(),
+               subdirectory);
 }
 
 Result<void> ContainerBuilder::_createTopLevelContainerDirectory() {
@@ -152,8 +154,9 @@ Result<void> ContainerBuilder::writeMetadata(const ZORMetadata& record) {
         return {};
     const ZORError cause = posixError(ZOR_HERE, written, "write of %s failed: %s", names::metadataFile,
                                       bytes ? written.text() : bytes.error().reason);
-    return makeError(log_, ZOR_HERE, ErrorCode::propertyListNotWritten, &cause, LogFlag::yes,
-                     "Failed to write metadata dictionary to URL %s", staging_.c_str());
+    return Reporter(log_, __func__)
+        .error(ErrorCode::propertyListNotWritten, &cause, "Failed to write metadata dictionary to URL %s",
+               staging_.c_str());
 }
 
 ContainerBuilder::Modes ContainerBuilder::modesOfSubdirectories() const {
@@ -197,8 +200,9 @@ Result<void> ContainerBuilder::orderBeforeMove(const fs::Durability& durability)
     if (!error)
         return {};
     const ZORError cause = posixError(ZOR_HERE, error, "sync of %s failed: %s", names::metadataFile, error.text());
-    return makeError(log_, ZOR_HERE, ErrorCode::propertyListNotWritten, &cause, LogFlag::yes,
-                     "Failed to write metadata dictionary to URL %s", staging_.c_str());
+    return Reporter(log_, __func__)
+        .error(ErrorCode::propertyListNotWritten, &cause, "Failed to write metadata dictionary to URL %s",
+               staging_.c_str());
 }
 
 } // namespace
@@ -212,8 +216,9 @@ auto ContainerMaker::orCleanUp(const FileURL& staging, Step&& step) -> decltype(
         const auto moved = needs_.deathRow._moveItemAtURLToDeathRow(staging, StartDeletionThread::yes);
         if (moved)
             return result;
-        return makeError(needs_.log, {function, __LINE__}, ErrorCode::stagingRemovalFailed, &moved.error(),
-                         LogFlag::yes, "Failed to remove staging dir: %s", staging.c_str());
+        return Reporter(needs_.log, function)
+            .error(ErrorCode::stagingRemovalFailed, &moved.error(), "Failed to remove staging dir: %s",
+                   staging.c_str());
     } catch (...) {
         (void)needs_.deathRow._moveItemAtURLToDeathRow(staging, StartDeletionThread::yes);
         throw;
@@ -225,9 +230,9 @@ Result<ContainerMaker::Built> ContainerMaker::build(std::uint32_t userId, const 
     UsableDirectory directory = needs_.configuration.openStagingDirectory();
     FileURL staging = directory.url.appendingDirectory(UUID::random().string());
     if (!directory.opened)
-        return makeError(needs_.log, {function, __LINE__}, ErrorCode::stagingDirectoryFailed, &directory.opened.error(),
-                         LogFlag::yes, "Failed to create staging dir at %s : %s", staging.c_str(),
-                         directory.opened.error().text().c_str());
+        return Reporter(needs_.log, function)
+            .error(ErrorCode::stagingDirectoryFailed, &directory.opened.error(),
+                   "Failed to create staging dir at %s : %s", staging.c_str(), directory.opened.error().text().c_str());
     auto record = std::make_shared<ZORMetadata>(userId, UUID::random(), containerClass, identifier, nullptr,
                                                 ContainerPlace(staging));
     record->setDurable(false);
@@ -265,7 +270,7 @@ Result<ContainerMaker::Placed> ContainerMaker::moveIntoPlace(const Built& built,
     const FileURL& staging = built.staging;
     const std::uint32_t userId = built.record->uid();
     const ContainerClass containerClass = built.record->containerClass();
-    constexpr Here here{function, __LINE__};
+    const Reporter report(needs_.log, function);
     // The fixed name is the live one's; a transient one has a name with which it can take its place.
     const std::string* wellKnown =
         transient ? nullptr : needs_.whitelist.wellknownContainerForId(built.record->identifier(), containerClass);
@@ -275,7 +280,8 @@ Result<ContainerMaker::Placed> ContainerMaker::moveIntoPlace(const Built& built,
         // A container that was looked for in one home is not made in another.
         const UserHome* const home = isPerUserClass(containerClass) ? needs_.configuration.homeOf(userId) : nullptr;
         if (!classDirectory || (home && home->generation() != homeGeneration))
-            return posixError(here, Errno(ENOENT), "the home of user %u is not there, or has just changed", userId);
+            return posixError({function, __LINE__}, Errno(ENOENT),
+                              "the home of user %u is not there, or has just changed", userId);
         live = classDirectory->url.appendingDirectory(wellKnown ? std::string_view(*wellKnown)
                                                                 : staging.lastPathComponent());
         if (!classDirectory->opened)
@@ -284,8 +290,8 @@ Result<ContainerMaker::Placed> ContainerMaker::moveIntoPlace(const Built& built,
         return Placed{.url = live, .classDirectory = std::move(*classDirectory->opened)};
     }();
     if (!moved)
-        return makeError(needs_.log, here, ErrorCode::moveToLiveFailed, &moved.error(), LogFlag::yes,
-                         "Failed to move staging dir: %s to live dir: %s", staging.c_str(), live.c_str());
+        return report.error(ErrorCode::moveToLiveFailed, &moved.error(),
+                            "Failed to move staging dir: %s to live dir: %s", staging.c_str(), live.c_str());
     return moved;
 }
 

@@ -43,19 +43,20 @@ Result<std::shared_ptr<ZORMetadata>> ContainerRemoval::find(const ContainerToGo&
 
 Result<void> ContainerRemoval::take(const ContainerToGo& container, const ZORMetadata& record,
                                     std::vector<FileURL>& changed, const AllIdentifiersWriteLock& /*held*/) {
+    const Reporter report(needs_.log, function);
     const auto& [userId, uuid, identifier, containerClass] = container;
     const bool transient = record.transient();
     if (!takeAway(record.url(), topLevelOwnerOf(record.containerClass(), record.uid()), changed))
         return {};
     if (isPerUserClass(containerClass) && !transient &&
         !needs_.mappings._setSandboxContainerMappingForUser(userId, identifier, containerClass, std::nullopt))
-        needs_.log.write(logLevelError, function, "Failed to remove container mapping in delete operation");
+        report.write(logLevelError, "Failed to remove container mapping in delete operation");
     const auto removed =
         needs_.cache.removeContainerForUser(userId, record.containerClass(), &record.identifier(), transient);
     if (!removed)
-        return makeError(needs_.log, {function, __LINE__}, ErrorCode::cacheRemoveFailed, &removed.error(), LogFlag::yes,
-                         "Failed to remove from cache id: %s, class: %ld, transient: %d", ZOR_SHOWN(identifier),
-                         static_cast<long>(containerClass), transient);
+        return report.error(ErrorCode::cacheRemoveFailed, &removed.error(),
+                            "Failed to remove from cache id: %s, class: %ld, transient: %d", ZOR_SHOWN(identifier),
+                            static_cast<long>(containerClass), transient);
     return {};
 }
 
@@ -64,8 +65,9 @@ Result<void> ContainerRemoval::conclude(Result<void> staged, std::vector<FileURL
     const auto failed = needs_.moves.syncDirectories(std::move(changed));
     if (!staged || !failed)
         return staged;
-    return makeError(needs_.log, {function, __LINE__}, ErrorCode::listForDeletionFailed, &*failed, LogFlag::yes,
-                     "Failed to make deletions durable: %s", failed->text().c_str());
+    return Reporter(needs_.log, function)
+        .error(ErrorCode::listForDeletionFailed, &*failed, "Failed to make deletions durable: %s",
+               failed->text().c_str());
 }
 
 bool ContainerRemoval::takeAway(const FileURL& container, std::optional<std::uint32_t> owner,
@@ -86,8 +88,9 @@ bool ContainerRemoval::takeAway(const FileURL& container, std::optional<std::uin
         changed.push_back(deathRow);
         return true;
     }
-    makeError(needs_.log, {function, __LINE__}, ErrorCode::listForDeletionFailed, &moved.error(), LogFlag::yes,
-              "Failed to delete container at %s: %s", container.c_str(), moved.error().text().c_str());
+    Reporter(needs_.log, function)
+        .error(ErrorCode::listForDeletionFailed, &moved.error(), "Failed to delete container at %s: %s",
+               container.c_str(), moved.error().text().c_str());
     return false;
 }
 

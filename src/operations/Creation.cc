@@ -71,21 +71,18 @@ Creation::createOrLookupContainerForUser(const Caller& caller, std::uint32_t use
 
 Result<void> Creation::checkRequest(const Caller& caller, std::uint32_t userId, const std::string* identifier,
                                     ContainerClass containerClass) {
-    constexpr Here here{function, __LINE__};
-    const Log& log = needs_.log;
+    const Reporter report(needs_.log, function);
     const long classNumber = static_cast<long>(containerClass);
     if (!identifier || !ipc::isIdentifier(*identifier) || !isValidClass(containerClass))
-        return makeError(log, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                         "Can't act on an invalid object: userId: %u, ID: %s, class: %ld", userId,
-                         ZOR_SHOWN(identifier), classNumber);
+        return report.error(ErrorCode::invalidObject, "Can't act on an invalid object: userId: %u, ID: %s, class: %ld",
+                            userId, ZOR_SHOWN(identifier), classNumber);
     if (!needs_.configuration.users().mayOwn(containerClass, userId))
-        return makeError(log, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                         "Invalid userId %u for class %ld, ID: %s", userId, classNumber, ZOR_SHOWN(*identifier));
+        return report.error(ErrorCode::invalidObject, "Invalid userId %u for class %ld, ID: %s", userId, classNumber,
+                            ZOR_SHOWN(*identifier));
     if (containerClass == ContainerClass::dataSystem && !caller.allowOtherIdLookup &&
         !needs_.entitlements.identifierHasSystemContainer(*identifier))
-        return makeError(log, here, ErrorCode::notEntitled, nullptr, LogFlag::yes,
-                         "%s not entitled for a system container, but %s is trying", ZOR_SHOWN(*identifier),
-                         ZOR_SHOWN(caller.bundleIdentifier));
+        return report.error(ErrorCode::notEntitled, "%s not entitled for a system container, but %s is trying",
+                            ZOR_SHOWN(*identifier), ZOR_SHOWN(caller.bundleIdentifier));
     return {};
 }
 
@@ -137,8 +134,8 @@ Result<std::optional<FoundContainer>> Creation::createOrLookup(const Wanted& wan
     else if (!record.error().is(ErrorCode::notFound))
         return std::move(record).error();
     if (!options.createIfNecessary)
-        return makeError(needs_.log, {function, __LINE__}, ErrorCode::notFound, nullptr, LogFlag::no,
-                         "Container with identifier: \"%s\" Not Found", ZOR_SHOWN(identifier));
+        return Reporter(needs_.log, function)
+            .unlogged(ErrorCode::notFound, "Container with identifier: \"%s\" Not Found", ZOR_SHOWN(identifier));
     // One in the place of another makes the user's share no larger.
     if (!record && !options.replacesAnother)
         TRY(checkShare(wanted));
@@ -151,11 +148,11 @@ Result<void> Creation::checkShare(const Wanted& wanted) {
     const std::size_t containers = needs_.cache.heldByUser(wanted.userId).containers;
     if (containers < needs_.limits.containersMaxPerUser)
         return {};
-    return makeError(
-        needs_.log, {function, __LINE__}, ErrorCode::valueNotAllowed, nullptr, LogFlag::yes,
-        "User %u has %llu containers, and no more may be made: %s. Delete some, or start zorvaned with a larger "
-        "--containers-per-user",
-        wanted.userId, static_cast<unsigned long long>(containers), ZOR_SHOWN(wanted.identifier));
+    return Reporter(needs_.log, function)
+        .error(ErrorCode::valueNotAllowed,
+               "User %u has %llu containers, and no more may be made: %s. Delete some, or start zorvaned with a larger "
+               "--containers-per-user",
+               wanted.userId, static_cast<unsigned long long>(containers), ZOR_SHOWN(wanted.identifier));
 }
 
 Result<void> Creation::discardTransient(const ZORMetadata& record, const std::string& identifier) {
@@ -164,8 +161,9 @@ Result<void> Creation::discardTransient(const ZORMetadata& record, const std::st
                                                                 topLevelOwnerOf(record.containerClass(), record.uid()));
     // With another's directory in its place, the container is gone.
     if (!moved && !(moved.error().underlying() && moved.error().underlying()->isPosix(DeathRow::notTheContainer)))
-        return makeError(needs_.log, {function, __LINE__}, ErrorCode::transientRemovalFailed, &moved.error(),
-                         LogFlag::yes, "Failed to remove transient container at %s", url.c_str());
+        return Reporter(needs_.log, function)
+            .error(ErrorCode::transientRemovalFailed, &moved.error(), "Failed to remove transient container at %s",
+                   url.c_str());
     // With its directory gone the record would answer "no metadata" for this identifier until the daemon ends, should
     // the container not be made again.
     return needs_.cache.removeContainerForUser(record.uid(), record.containerClass(), &identifier, true);
@@ -183,9 +181,10 @@ Result<FoundContainer> Creation::create(const Wanted& wanted, std::optional<Cont
     record->setTransient(transient);
     const auto added = needs_.cache.addContainerMetadata(record, wanted.userId, ContainerPlace(live), transient);
     if (!added)
-        return makeError(needs_.log, {function, __LINE__}, ErrorCode::cacheAddFailed, &added.error(), LogFlag::yes,
-                         "Failed to add to cache for %u : %s, url: %s, transient: %d", wanted.userId,
-                         ZOR_SHOWN(wanted.identifier), live.c_str(), transient);
+        return Reporter(needs_.log, function)
+            .error(ErrorCode::cacheAddFailed, &added.error(),
+                   "Failed to add to cache for %u : %s, url: %s, transient: %d", wanted.userId,
+                   ZOR_SHOWN(wanted.identifier), live.c_str(), transient);
     FoundContainer made = snapshot(record);
     made.movedInto = std::make_shared<const platform::FileDescriptor>(std::move(classDirectory));
     return made;

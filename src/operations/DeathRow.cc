@@ -51,6 +51,7 @@ bool DeathRow::isOf(int directory, std::uint32_t owner) {
 
 Result<void> DeathRow::_moveItemAtURLToDeathRow(const FileURL& url, StartDeletionThread startDeletionThread,
                                                 std::optional<std::uint32_t> owner) {
+    const Reporter report(needs_.log, moveFunction);
     ZORFileManager& fileManager = needs_.fileManager;
     const FileURL deathRow = needs_.configuration.deathrowDirectory();
     for (int tried = 0;; ++tried) {
@@ -66,8 +67,8 @@ Result<void> DeathRow::_moveItemAtURLToDeathRow(const FileURL& url, StartDeletio
             return condemn(url, destination, owner, moving);
         }();
         if (!unique)
-            return makeError(needs_.log, {moveFunction, __LINE__}, ErrorCode::moveToDeathRowFailed, &moved.error(),
-                             LogFlag::yes, "Failed to create unique directory at: %s", url.c_str());
+            return report.error(ErrorCode::moveToDeathRowFailed, &moved.error(),
+                                "Failed to create unique directory at: %s", url.c_str());
         if (moved && *moved != Row::ofRoot)
             (void)fileManager.removeItemAtURL(unique);
         if (moved) {
@@ -82,9 +83,8 @@ Result<void> DeathRow::_moveItemAtURLToDeathRow(const FileURL& url, StartDeletio
             return {};
         if (somethingMissing && fileManager.itemDoesNotExistAtURL(*unique) && tried < directoriesTriedMax)
             continue;
-        return makeError(needs_.log, {moveFunction, __LINE__}, ErrorCode::moveToDeathRowFailed, &moved.error(),
-                         LogFlag::yes, "Failed to move item at: %s to: %s", url.c_str(),
-                         unique->appendingDirectory(url.lastPathComponent()).c_str());
+        return report.error(ErrorCode::moveToDeathRowFailed, &moved.error(), "Failed to move item at: %s to: %s",
+                            url.c_str(), unique->appendingDirectory(url.lastPathComponent()).c_str());
     }
 }
 
@@ -320,8 +320,9 @@ Result<void> DeathRow::forEachCondemned(int directory, const FileURL& row,
             const auto removed = needs_.boundary.run(here, [&] { return remove(item); });
             if (!removed) {
                 pass.left.add(item.path());
-                pass.last = makeError(needs_.log, here, ErrorCode::deathRowItemNotDestroyed, &removed.error(),
-                                      LogFlag::yes, "Failed to destroy item at: %s", item.c_str());
+                pass.last = Reporter(needs_.log, here.function)
+                                .error({ErrorCode::deathRowItemNotDestroyed, here.line}, &removed.error(),
+                                       "Failed to destroy item at: %s", item.c_str());
             }
             return true;
         });
@@ -339,11 +340,11 @@ void DeathRow::deleteEverythingOnDeathRow(Pass& pass) {
                                          deathRow.c_str(), opened.error().text()));
     if (emptied)
         return;
-    pass.last = emptied.error().isPosix(ENOENT)
-                    ? emptied.error()
-                    : makeError(needs_.log, {passFunction, __LINE__}, ErrorCode::listForDeletionFailed,
-                                &emptied.error(), LogFlag::yes, "Failed to get items for deletion: %s : %s",
-                                deathRow.c_str(), emptied.error().text().c_str());
+    pass.last = emptied.error().isPosix(ENOENT) ? emptied.error()
+                                                : Reporter(needs_.log, passFunction)
+                                                      .error(ErrorCode::listForDeletionFailed, &emptied.error(),
+                                                             "Failed to get items for deletion: %s : %s",
+                                                             deathRow.c_str(), emptied.error().text().c_str());
 }
 
 void DeathRow::deleteEverythingHidden(Pass& pass) {
@@ -362,8 +363,9 @@ void DeathRow::deleteEverythingHidden(Pass& pass) {
         if (removed)
             continue;
         pass.left.add(one.url.path());
-        pass.last = makeError(needs_.log, {passFunction, __LINE__}, ErrorCode::deathRowItemNotDestroyed,
-                              &removed.error(), LogFlag::yes, "Failed to destroy item at: %s", one.url.c_str());
+        pass.last = Reporter(needs_.log, passFunction)
+                        .error(ErrorCode::deathRowItemNotDestroyed, &removed.error(), "Failed to destroy item at: %s",
+                               one.url.c_str());
         if (removed.error().isPosix(ESTALE))
             continue;
         const platform::MutexLock held(hiddenMutex_);
@@ -383,9 +385,10 @@ void DeathRow::deleteEverythingOnDeathRowOf(const FileURL& place, Pass& pass) {
     const auto emptied = forEachCondemned(
         row->get(), url, [&](const FileURL& item) { return fileManager.removeItemIn(row->get(), item); }, pass);
     if (!emptied)
-        pass.last = makeError(needs_.log, {passFunction, __LINE__}, ErrorCode::listForDeletionFailed, &emptied.error(),
-                              LogFlag::yes, "Failed to get items for deletion: %s : %s", url.c_str(),
-                              emptied.error().text().c_str());
+        pass.last =
+            Reporter(needs_.log, passFunction)
+                .error(ErrorCode::listForDeletionFailed, &emptied.error(), "Failed to get items for deletion: %s : %s",
+                       url.c_str(), emptied.error().text().c_str());
     const platform::MutexLock moving(moving_);
     fs::removeEmptyDeathRow(fileManager.disk(), top->directory.get());
 }
@@ -401,8 +404,9 @@ Result<void> DeathRow::_removeItemOrMoveToTempAtURL(const FileURL& url) {
     const auto moved = moveToTemporary(url, temporary.appendingDirectory(url.lastPathComponent()));
     if (moved)
         return {};
-    return makeError(needs_.log, ZOR_HERE, ErrorCode::moveToTemporaryFailed, &moved.error(), LogFlag::yes,
-                     "Failed to move dir: %s to: %s", url.c_str(), temporary.c_str());
+    return Reporter(needs_.log, __func__)
+        .error(ErrorCode::moveToTemporaryFailed, &moved.error(), "Failed to move dir: %s to: %s", url.c_str(),
+               temporary.c_str());
 }
 
 Result<void> DeathRow::moveToTemporary(const FileURL& url, const FileURL& destination) {

@@ -43,10 +43,11 @@ Result<void> Deletion::stageForDeleteContainersWithUsers(const DeletionBatch& ba
     return needs_.boundary.run({stageFunction, __LINE__}, [&]() -> Result<void> {
         const std::size_t count = batch.uuids.size();
         if (count != batch.classes.size() || count != batch.identifiers.size())
-            return makeError(needs_.log, {stageFunction, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                             "Can't act on an invalid input: UUIDString count: %ld, class count: %ld, ID count: %ld",
-                             static_cast<long>(count), static_cast<long>(batch.classes.size()),
-                             static_cast<long>(batch.identifiers.size()));
+            return Reporter(needs_.log, stageFunction)
+                .error(ErrorCode::invalidObject,
+                       "Can't act on an invalid input: UUIDString count: %ld, class count: %ld, ID count: %ld",
+                       static_cast<long>(count), static_cast<long>(batch.classes.size()),
+                       static_cast<long>(batch.identifiers.size()));
         Progress progress;
         for (std::size_t index = 0; index < count && index < batch.users.size(); ++index)
             prepare(batch, index);
@@ -89,20 +90,21 @@ Result<void> Deletion::stageNext(const DeletionBatch& batch, Progress& progress,
 
 Result<void> Deletion::stageForDelete(const DeletionBatch& batch, Progress& progress,
                                       const AllIdentifiersWriteLock& lock) {
+    const Reporter report(needs_.log, stageFunction);
     const std::size_t index = progress.next;
     const std::uint32_t userId = userAt(batch.users, index);
     if (!batch.classes[index]) {
-        makeError(needs_.log, {stageFunction, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                  "Can't act on an invalid object: class: %s", ZOR_SHOWN(batch.classes[index].error()));
+        report.error(ErrorCode::invalidObject, "Can't act on an invalid object: class: %s",
+                     ZOR_SHOWN(batch.classes[index].error()));
         return {};
     }
     const auto containerClass = static_cast<ContainerClass>(*batch.classes[index]);
     const auto& uuid = batch.uuids[index];
     const auto& identifier = batch.identifiers[index];
     if (!uuid || !identifier || !isValidClass(containerClass)) {
-        makeError(needs_.log, {stageFunction, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                  "Can't act on an invalid object: userId: %u, UUID: %s, ID: %s, Class: %ld", userId,
-                  uuid ? uuid->string().c_str() : "(null)", ZOR_SHOWN(identifier), static_cast<long>(containerClass));
+        report.error(
+            ErrorCode::invalidObject, "Can't act on an invalid object: userId: %u, UUID: %s, ID: %s, Class: %ld",
+            userId, uuid ? uuid->string().c_str() : "(null)", ZOR_SHOWN(identifier), static_cast<long>(containerClass));
         return {};
     }
     const ContainerToGo container{

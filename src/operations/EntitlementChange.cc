@@ -124,14 +124,14 @@ void EntitlementChange::sayIfNotCleared(const std::string& identifier, ErrorCode
 Result<void> EntitlementChange::process(const plist::Dictionary* entitlements, const std::string& identifier,
                                         const plist::Dictionary* options, std::optional<Change>& change,
                                         const AllIdentifiersWriteLock& lock) {
+    const Reporter report(needs_.log, processFunction);
     try {
         if (!canBeProcessed(identifier, options))
-            return makeError(needs_.log, {processFunction, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                             "Can't act on an invalid object: ID: %s, parent ID: %s", ZOR_SHOWN(identifier),
-                             plist::describe(parentIn(options)).c_str());
+            return report.error(ErrorCode::invalidObject, "Can't act on an invalid object: ID: %s, parent ID: %s",
+                                ZOR_SHOWN(identifier), plist::describe(parentIn(options)).c_str());
         if (const char* why = whyGroupsAreUnusable(entitlements))
-            return makeError(needs_.log, {processFunction, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                             "Can't act on an invalid object: ID: %s: %s", ZOR_SHOWN(identifier), why);
+            return report.error(ErrorCode::invalidObject, "Can't act on an invalid object: ID: %s: %s",
+                                ZOR_SHOWN(identifier), why);
         change = TRY(planReleaseApply(entitlements, identifier, options, lock));
         return {};
     } catch (const std::exception& exception) {
@@ -162,26 +162,26 @@ EntitlementChange::planReleaseApply(const plist::Dictionary* entitlements, const
 
 Result<void> EntitlementChange::releaseSystemContainer(const std::string& identifier, std::vector<FileURL>& changed,
                                                        const AllIdentifiersWriteLock& lock) {
+    const Reporter report(needs_.log, processFunction);
     const std::uint32_t user = needs_.configuration.users().system;
     // Between its moves a replace has no live container.
     TRY(needs_.removal.refuseIfUnderWay(user, ContainerClass::dataSystem, identifier));
     const auto record = needs_.cache.containerForUser(user, ContainerClass::dataSystem, &identifier, false);
     if (!record) {
-        needs_.log.write(logLevelError, processFunction, "Failed to retrieve system container %s: %s",
-                         ZOR_SHOWN(identifier), record.error().text().c_str());
+        report.write(logLevelError, "Failed to retrieve system container %s: %s", ZOR_SHOWN(identifier),
+                     record.error().text().c_str());
         return {};
     }
-    needs_.log.write(logLevelError, processFunction,
-                     "Deleting system container for ID: %s because it is no longer in the entitlements",
-                     ZOR_SHOWN(identifier));
+    report.write(logLevelError, "Deleting system container for ID: %s because it is no longer in the entitlements",
+                 ZOR_SHOWN(identifier));
     const auto staged = needs_.removal.stage({.userId = user,
                                               .uuid = (*record)->uuid(),
                                               .identifier = identifier,
                                               .containerClass = (*record)->containerClass()},
                                              changed, lock);
     if (!staged)
-        needs_.log.write(logLevelError, processFunction, "Failed to destroy system container with identifier %s: %llu",
-                         ZOR_SHOWN(identifier), static_cast<unsigned long long>(staged.error().replyCode()));
+        report.write(logLevelError, "Failed to destroy system container with identifier %s: %llu",
+                     ZOR_SHOWN(identifier), static_cast<unsigned long long>(staged.error().replyCode()));
     return {};
 }
 

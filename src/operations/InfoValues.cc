@@ -35,16 +35,17 @@ Result<void> InfoValues::checkInfoShare(const Caller& caller, const ZORMetadata&
         posixError({setFunction, __LINE__}, Errno(EDQUOT),
                    "the info values of user %u's containers take %llu bytes, and no more may be kept", record.uid(),
                    static_cast<unsigned long long>(held));
-    return makeError(needs_.log, {setFunction, __LINE__}, ErrorCode::propertyListNotWritten, &cause, LogFlag::yes,
-                     "Failed to write metadata dictionary to URL %s", record.url().c_str());
+    return Reporter(needs_.log, setFunction)
+        .error(ErrorCode::propertyListNotWritten, &cause, "Failed to write metadata dictionary to URL %s",
+               record.url().c_str());
 }
 
 Result<void> InfoValues::checkSet(const std::string* key, const ContainerAddress& address) {
     TRY(checkAddress(needs_.log, setFunction, address));
     if (key)
         return {};
-    return makeError(needs_.log, {setFunction, __LINE__}, ErrorCode::valueNotAllowed, nullptr, LogFlag::yes,
-                     "Can't set nil or non-VString key: %s", "(null)");
+    return Reporter(needs_.log, setFunction)
+        .error(ErrorCode::valueNotAllowed, "Can't set nil or non-VString key: %s", "(null)");
 }
 
 Result<void> InfoValues::setInfoValue(const Caller& caller, const plist::Value* value, const std::string* key,
@@ -87,9 +88,9 @@ Result<void> InfoValues::set(const Caller& caller, const plist::Value* value, co
     record->setInfoIsSaved(true);
     const auto added = needs_.cache.addContainerMetadata(record, address.userId, record->place(), record->transient());
     if (!added)
-        return makeError(needs_.log, {setFunction, __LINE__}, ErrorCode::cacheAddFailed, &added.error(), LogFlag::yes,
-                         "Failed to add to cache: %s, url: %s, transient: %d", ZOR_SHOWN(record->identifier()),
-                         record->url().c_str(), record->transient());
+        return Reporter(needs_.log, setFunction)
+            .error(ErrorCode::cacheAddFailed, &added.error(), "Failed to add to cache: %s, url: %s, transient: %d",
+                   ZOR_SHOWN(record->identifier()), record->url().c_str(), record->transient());
     return {};
 }
 
@@ -97,8 +98,8 @@ Result<void> InfoValues::checkGet(const std::string* key, const ContainerAddress
     TRY(checkAddress(needs_.log, getFunction, address));
     if (key)
         return {};
-    return makeError(needs_.log, {getFunction, __LINE__}, ErrorCode::valueNotAllowed, nullptr, LogFlag::yes,
-                     "Can't get nil or non-VString key: %s", "(null)");
+    return Reporter(needs_.log, getFunction)
+        .error(ErrorCode::valueNotAllowed, "Can't get nil or non-VString key: %s", "(null)");
 }
 
 Result<plist::Value> InfoValues::infoValueForKey(const std::string* key, const ContainerAddress& address) {
@@ -122,8 +123,8 @@ Result<plist::Value> InfoValues::get(const std::string& key, const ContainerAddr
     const auto record = TRY(knownContainer(needs_.log, needs_.cache, getFunction, address, held));
     const plist::Value* value = record->info() ? record->info()->find(key) : nullptr;
     if (!value)
-        return makeError(needs_.log, {getFunction, __LINE__}, ErrorCode::infoKeyNotFound, nullptr, LogFlag::no,
-                         "Didn't find info value for key: %s", ZOR_SHOWN(key));
+        return Reporter(needs_.log, getFunction)
+            .unlogged(ErrorCode::infoKeyNotFound, "Didn't find info value for key: %s", ZOR_SHOWN(key));
     return *value;
 }
 

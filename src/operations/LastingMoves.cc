@@ -42,9 +42,9 @@ Errno LastingMoves::orderBetween(const FileURL& changed, const FileURL& next) co
 
 ZORError LastingMoves::notLasting(const char* function, ErrorCode code, const FileURL& container,
                                   const ZORError& cause) const {
-    return makeError(log_, {function, __LINE__}, code, &cause, LogFlag::yes,
-                     "%s is in its place, but a power cut may undo that (%s); ask for it again", container.c_str(),
-                     cause.text().c_str());
+    return Reporter(log_, function)
+        .error(code, &cause, "%s is in its place, but a power cut may undo that (%s); ask for it again",
+               container.c_str(), cause.text().c_str());
 }
 
 bool SandboxMappings::_setSandboxContainerMappingForUser(std::uint32_t userId, const std::string& identifier,

@@ -18,9 +18,9 @@ std::vector<ListedContainer> listed(const std::vector<ZORContainerCache::Record>
 Result<void> Listing::checkListedClass(std::uint32_t userId, ContainerClass containerClass) {
     if (isValidClass(containerClass))
         return {};
-    return makeError(needs_.log, {"containersForUser", __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                     "Can't act on an invalid container-userId: %u, class: %ld", userId,
-                     static_cast<long>(containerClass));
+    return Reporter(needs_.log, "containersForUser")
+        .error(ErrorCode::invalidObject, "Can't act on an invalid container-userId: %u, class: %ld", userId,
+               static_cast<long>(containerClass));
 }
 
 Result<std::vector<ListedContainer>> Listing::containersForUser(std::uint32_t userId, ContainerClass containerClass,

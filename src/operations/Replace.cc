@@ -152,56 +152,51 @@ ZORError Replace::changedTooOften(const Progress& progress) {
 }
 
 ZORError Replace::oldNotMoved(const Progress& progress, const ZORError& cause) {
-    return makeError(needs_.log, {replaceFunction, __LINE__}, ErrorCode::oldNotMovedToStaging, &cause, LogFlag::yes,
-                     "Failed to move old %s to staging %s", progress.oldUrl.c_str(),
-                     progress.prepared.journal.waitingUrl().c_str());
+    return Reporter(needs_.log, replaceFunction)
+        .error(ErrorCode::oldNotMovedToStaging, &cause, "Failed to move old %s to staging %s", progress.oldUrl.c_str(),
+               progress.prepared.journal.waitingUrl().c_str());
 }
 
 Result<void> Replace::checkReplace(const ReplaceRequest& request) {
-    const Log& log = needs_.log;
-    const Here here{replaceFunction, __LINE__};
+    const Reporter report(needs_.log, replaceFunction);
     if (!request.newUuid || !isValidClass(request.classNew))
-        return makeError(log, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                         "Can't act on an invalid object: new userId: %u, newUUID: %s, Class: %ld", request.userIdNew,
-                         shown(request.newUuid).c_str(), static_cast<long>(request.classNew));
+        return report.error(ErrorCode::invalidObject,
+                            "Can't act on an invalid object: new userId: %u, newUUID: %s, Class: %ld",
+                            request.userIdNew, shown(request.newUuid).c_str(), static_cast<long>(request.classNew));
     if (!request.oldUuid && request.preserveOldUuid == PreserveOldUUID::yes)
-        return makeError(log, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                         "Can't have a nil oldContainerUUID when preserving the UUID");
+        return report.error(ErrorCode::invalidObject, "Can't have a nil oldContainerUUID when preserving the UUID");
     if (!request.oldUuid)
         return {};
     if (!isValidClass(request.classOld))
-        return makeError(log, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                         "Can't act on an invalid object: old userId: %u, oldUUID: %s, Class: %ld", request.userIdOld,
-                         shown(request.oldUuid).c_str(), static_cast<long>(request.classOld));
+        return report.error(ErrorCode::invalidObject,
+                            "Can't act on an invalid object: old userId: %u, oldUUID: %s, Class: %ld",
+                            request.userIdOld, shown(request.oldUuid).c_str(), static_cast<long>(request.classOld));
     if (request.classOld != request.classNew)
-        return makeError(log, here, ErrorCode::classesDiffer, nullptr, LogFlag::yes,
-                         "Can't replace containers of different class types: %ld and %ld",
-                         static_cast<long>(request.classOld), static_cast<long>(request.classNew));
+        return report.error(ErrorCode::classesDiffer, "Can't replace containers of different class types: %ld and %ld",
+                            static_cast<long>(request.classOld), static_cast<long>(request.classNew));
     if (request.userIdOld != request.userIdNew)
-        return makeError(log, here, ErrorCode::usersDiffer, nullptr, LogFlag::yes,
-                         "Can't replace containers of different userIds: %u and %u", request.userIdOld,
-                         request.userIdNew);
+        return report.error(ErrorCode::usersDiffer, "Can't replace containers of different userIds: %u and %u",
+                            request.userIdOld, request.userIdNew);
     return {};
 }
 
 ZORError Replace::notInPlace(const Progress& progress, const ZORError& cause) {
-    return makeError(needs_.log, {replaceFunction, __LINE__}, ErrorCode::newNotMovedIntoPlace, &cause, LogFlag::yes,
-                     "Failed to replace: %s with: %s at: %s", progress.oldUrl.c_str(), progress.newUrl.c_str(),
-                     progress.destUrl.c_str());
+    return Reporter(needs_.log, replaceFunction)
+        .error(ErrorCode::newNotMovedIntoPlace, &cause, "Failed to replace: %s with: %s at: %s",
+               progress.oldUrl.c_str(), progress.newUrl.c_str(), progress.destUrl.c_str());
 }
 
 Result<void> Replace::prepareReplace(const ReplaceRequest& request, Progress& progress,
                                      const AllIdentifiersWriteLock& lock) {
-    const Log& log = needs_.log;
-    const Here here{replaceFunction, __LINE__};
+    const Reporter report(needs_.log, replaceFunction);
     const auto known = [&](std::uint32_t userId, const std::optional<UUID>& uuid,
                            const std::optional<std::string>& identifier,
                            ContainerClass containerClass) -> Result<std::shared_ptr<ZORMetadata>> {
         auto record = TRY(needs_.recovery.settledContainer(userId, containerClass, pointerTo(identifier), *uuid, lock));
         if (!record)
-            return makeError(log, here, ErrorCode::notFound, nullptr, LogFlag::yes,
-                             "No Container with userId: %u UUID: %s, identifier: %s, Class: %ld", userId,
-                             uuid->string().c_str(), ZOR_SHOWN(identifier), static_cast<long>(containerClass));
+            return report.error(ErrorCode::notFound,
+                                "No Container with userId: %u UUID: %s, identifier: %s, Class: %ld", userId,
+                                uuid->string().c_str(), ZOR_SHOWN(identifier), static_cast<long>(containerClass));
         return record;
     };
     if (request.oldUuid) {
@@ -212,12 +207,12 @@ Result<void> Replace::prepareReplace(const ReplaceRequest& request, Progress& pr
     progress.newRecord = TRY(known(request.userIdNew, request.newUuid, request.identifierNew, request.classNew));
     progress.newUrl = progress.newRecord->url();
     if (progress.newUrl == progress.oldUrl)
-        return makeError(log, here, ErrorCode::replacedByItself, nullptr, LogFlag::yes,
-                         "Can't replace the same container at %s", progress.oldUrl.c_str());
+        return report.error(ErrorCode::replacedByItself, "Can't replace the same container at %s",
+                            progress.oldUrl.c_str());
     const auto directoryUuid = UUID::parse(progress.newUrl.lastPathComponent());
     if (!directoryUuid)
-        return makeError(log, here, ErrorCode::pathNotAsExpected, nullptr, LogFlag::yes,
-                         "Invalid URL (last path component not UUID): %s", progress.newUrl.c_str());
+        return report.error(ErrorCode::pathNotAsExpected, "Invalid URL (last path component not UUID): %s",
+                            progress.newUrl.c_str());
     if (request.preserveOldUuid == PreserveOldUUID::yes) {
         progress.destUrl = progress.oldUrl;
     } else {
@@ -225,8 +220,7 @@ Result<void> Replace::prepareReplace(const ReplaceRequest& request, Progress& pr
         progress.destUrl = destination.value_or(FileURL());
         if (!destination ||
             (progress.destUrl != progress.oldUrl && !needs_.fileManager.itemDoesNotExistAtURL(progress.destUrl)))
-            return makeError(log, here, ErrorCode::alreadyExists, nullptr, LogFlag::yes,
-                             "Container already exists at %s", progress.destUrl.c_str());
+            return report.error(ErrorCode::alreadyExists, "Container already exists at %s", progress.destUrl.c_str());
     }
     return refuseSecondOfIdentifier(progress);
 }
@@ -253,10 +247,9 @@ Result<void> Replace::refuseSecondOfIdentifier(const Progress& progress) {
     // With an old one, the one that is found may be the new one itself; one that has lost its files is none.
     if (!live || (progress.oldRecord && *live == progress.newRecord))
         return {};
-    return makeError(needs_.log, {replaceFunction, __LINE__}, ErrorCode::alreadyExists, nullptr, LogFlag::yes,
-                     "Container with identifier: %s, class: %ld, transient: %d already exists",
-                     ZOR_SHOWN(record.identifier()), static_cast<long>(record.containerClass()),
-                     progress.oldWasTransient);
+    return Reporter(needs_.log, replaceFunction)
+        .error(ErrorCode::alreadyExists, "Container with identifier: %s, class: %ld, transient: %d already exists",
+               ZOR_SHOWN(record.identifier()), static_cast<long>(record.containerClass()), progress.oldWasTransient);
 }
 
 // Everything of a replace that waits for the disk before its moves: the old UUID in the new one's file, the copy of a
@@ -399,12 +392,13 @@ Result<void> Replace::copyNew(Prepared& prepared, bool stagingIsBeside) {
     }();
     if (copied)
         return {};
-    return makeError(needs_.log, {replaceFunction, __LINE__}, ErrorCode::newNotMovedIntoPlace, &copied.error(),
-                     LogFlag::yes, "Failed to replace: %s with: %s at: %s", prepared.oldUrl.c_str(),
-                     prepared.newUrl.c_str(), prepared.destUrl.c_str());
+    return Reporter(needs_.log, replaceFunction)
+        .error(ErrorCode::newNotMovedIntoPlace, &copied.error(), "Failed to replace: %s with: %s at: %s",
+               prepared.oldUrl.c_str(), prepared.newUrl.c_str(), prepared.destUrl.c_str());
 }
 
 Result<void> Replace::writeJournal(Prepared& prepared, bool stagingIsBeside) {
+    const Reporter report(needs_.log, replaceFunction);
     const UUID uuid = UUID::random();
     prepared.journal = {.oldUrl = prepared.oldUrl,
                         .newUrl = prepared.newUrl,
@@ -419,15 +413,13 @@ Result<void> Replace::writeJournal(Prepared& prepared, bool stagingIsBeside) {
         return {};
     }();
     if (!opened)
-        return makeError(needs_.log, {replaceFunction, __LINE__}, ErrorCode::oldNotMovedToStaging, &opened.error(),
-                         LogFlag::yes, "Failed to move old %s to staging %s", prepared.oldUrl.c_str(),
-                         prepared.journal.waitingUrl().c_str());
+        return report.error(ErrorCode::oldNotMovedToStaging, &opened.error(), "Failed to move old %s to staging %s",
+                            prepared.oldUrl.c_str(), prepared.journal.waitingUrl().c_str());
     prepared.journalUrl = ReplaceJournal::urlFor(needs_.configuration.replaceDirectory(), uuid);
     prepared.hasJournal = true; // also where only its last sync failed
     const auto written = prepared.journal._writeToDiskReplaceAt(needs_.log, needs_.fileManager, prepared.journalUrl);
     if (!written)
-        needs_.log.write(logLevelError, replaceFunction, "Failed to write replace file: %s",
-                         written.error().text().c_str());
+        report.write(logLevelError, "Failed to write replace file: %s", written.error().text().c_str());
     return written;
 }
 

@@ -88,9 +88,10 @@ Result<void> Replace::forgetOld(const ReplaceRequest& request, const Progress& p
     const auto removed = needs_.cache.removeContainerForUser(request.userIdOld, request.classOld,
                                                              &progress.oldRecord->identifier(), transient);
     if (!removed)
-        return makeError(needs_.log, {replaceFunction, __LINE__}, ErrorCode::cacheRemoveFailed, &removed.error(),
-                         LogFlag::yes, "Failed to remove from cache id: %s, class: %ld, transient: %d",
-                         ZOR_SHOWN(progress.oldRecord->identifier()), static_cast<long>(request.classOld), transient);
+        return Reporter(needs_.log, replaceFunction)
+            .error(ErrorCode::cacheRemoveFailed, &removed.error(),
+                   "Failed to remove from cache id: %s, class: %ld, transient: %d",
+                   ZOR_SHOWN(progress.oldRecord->identifier()), static_cast<long>(request.classOld), transient);
     return {};
 }
 
@@ -140,7 +141,7 @@ void Replace::restoreUuid(Progress& progress) {
 }
 
 ZORError Replace::undoFirstMove(Progress& progress, const ZORError& cause) {
-    const Log& log = needs_.log;
+    const Reporter report(needs_.log, replaceFunction);
     const auto& directories = progress.directories;
     const auto undone = needs_.fileManager.moveItem(progress.prepared.waiting.get(), progress.waitingUrl,
                                                     directories.old.get(), progress.oldUrl);
@@ -149,18 +150,18 @@ ZORError Replace::undoFirstMove(Progress& progress, const ZORError& cause) {
         // Its record may have left the cache already. Should that fail, the next reading of its class finds it.
         (void)needs_.cache.addContainerMetadata(progress.oldRecord, progress.oldRecord->uid(),
                                                 ContainerPlace(progress.oldUrl), progress.oldWasTransient);
-        return makeError(log, {replaceFunction, __LINE__}, ErrorCode::oldNotMovedToStaging, &cause, LogFlag::yes,
-                         "Failed to move old %s to staging %s", progress.oldUrl.c_str(), progress.waitingUrl.c_str());
+        return report.error(ErrorCode::oldNotMovedToStaging, &cause, "Failed to move old %s to staging %s",
+                            progress.oldUrl.c_str(), progress.waitingUrl.c_str());
     }
     progress.oldWaits = true;
     (void)needs_.cache.removeContainerForUser(progress.oldRecord->uid(), progress.oldRecord->containerClass(),
                                               &progress.oldRecord->identifier(), progress.oldWasTransient);
-    return makeError(log, {replaceFunction, __LINE__}, ErrorCode::journalUnusable, &undone.error(), LogFlag::yes,
-                     "Failed to recover replace move: %s to %s", progress.waitingUrl.c_str(), progress.oldUrl.c_str());
+    return report.error(ErrorCode::journalUnusable, &undone.error(), "Failed to recover replace move: %s to %s",
+                        progress.waitingUrl.c_str(), progress.oldUrl.c_str());
 }
 
 Result<void> Replace::putNewInPlace(const ReplaceRequest& request, Progress& progress) {
-    const Log& log = needs_.log;
+    const Reporter report(needs_.log, replaceFunction);
     ZORMetadata& record = *progress.newRecord;
     if (const auto moved = moveNew(progress); !moved)
         return notInPlace(progress, moved.error());
@@ -170,9 +171,9 @@ Result<void> Replace::putNewInPlace(const ReplaceRequest& request, Progress& pro
     const auto removed =
         needs_.cache.removeContainerForUser(request.userIdNew, request.classNew, &record.identifier(), newWasTransient);
     if (!removed)
-        return makeError(log, {replaceFunction, __LINE__}, ErrorCode::cacheRemoveFailed, &removed.error(), LogFlag::yes,
-                         "Failed to remove from cache id: %s, class: %ld, transient: %d",
-                         ZOR_SHOWN(record.identifier()), static_cast<long>(request.classNew), newWasTransient);
+        return report.error(ErrorCode::cacheRemoveFailed, &removed.error(),
+                            "Failed to remove from cache id: %s, class: %ld, transient: %d",
+                            ZOR_SHOWN(record.identifier()), static_cast<long>(request.classNew), newWasTransient);
     if (isPerUserClass(request.classNew)) {
         // Mappings are of live ones alone.
         const bool becomesLive = !progress.oldWasTransient;
@@ -184,15 +185,15 @@ Result<void> Replace::putNewInPlace(const ReplaceRequest& request, Progress& pro
         if ((becomesLive || !newWasTransient) && !needs_.mappings._setSandboxContainerMappingForUser(
                                                      request.userIdNew, record.identifier(), request.classNew,
                                                      becomesLive ? std::optional(progress.destUrl) : std::nullopt))
-            log.write(logLevelError, replaceFunction, "Failed to set container mapping in replace operation");
+            report.write(logLevelError, "Failed to set container mapping in replace operation");
     }
     record.setTransient(progress.oldWasTransient);
     const auto added = needs_.cache.addContainerMetadata(progress.newRecord, request.userIdNew,
                                                          ContainerPlace(progress.destUrl), progress.oldWasTransient);
     if (!added)
-        return makeError(log, {replaceFunction, __LINE__}, ErrorCode::cacheAddFailed, &added.error(), LogFlag::yes,
-                         "Failed to add to cache: %s, url: %s, transient: %d", ZOR_SHOWN(record.identifier()),
-                         progress.destUrl.c_str(), progress.oldWasTransient);
+        return report.error(ErrorCode::cacheAddFailed, &added.error(),
+                            "Failed to add to cache: %s, url: %s, transient: %d", ZOR_SHOWN(record.identifier()),
+                            progress.destUrl.c_str(), progress.oldWasTransient);
     return {};
 }
 
@@ -228,6 +229,7 @@ Result<void> Replace::moveNew(Progress& progress) {
 }
 
 void Replace::recoverFromException(Progress& progress) {
+    const Reporter report(needs_.log, replaceFunction);
     ZORFileManager& fileManager = needs_.fileManager;
     if (progress.swapped) {
         // Nothing waits in staging. The cache may know some of what has happened, and the disk knows all.
@@ -238,8 +240,8 @@ void Replace::recoverFromException(Progress& progress) {
         !fileManager.itemDoesNotExistAtURL(progress.destUrl))
         return;
     if (needs_.log.writes(logLevelDebug))
-        needs_.log.write(logLevelDebug, replaceFunction, "Recovering from exception by moving: %s to %s",
-                         progress.waitingUrl.c_str(), progress.oldUrl.c_str());
+        report.write(logLevelDebug, "Recovering from exception by moving: %s to %s", progress.waitingUrl.c_str(),
+                     progress.oldUrl.c_str());
     const auto moved = fileManager.moveItem(progress.prepared.waiting.get(), progress.waitingUrl,
                                             progress.directories.old.get(), progress.oldUrl);
     if (moved) {
@@ -248,13 +250,14 @@ void Replace::recoverFromException(Progress& progress) {
                                                 ContainerPlace(progress.oldUrl), progress.oldWasTransient);
         return;
     }
-    makeError(needs_.log, {replaceFunction, __LINE__}, ErrorCode::journalUnusable, &moved.error(), LogFlag::yes,
-              "Failed to recover replace move: %s to %s", progress.waitingUrl.c_str(), progress.oldUrl.c_str());
+    report.error(ErrorCode::journalUnusable, &moved.error(), "Failed to recover replace move: %s to %s",
+                 progress.waitingUrl.c_str(), progress.oldUrl.c_str());
     // The journal stays, and the next launch tries again: going on would let the clean-up take the old container.
     std::abort();
 }
 
 std::optional<ZORError> Replace::cleanUpReplace(Progress& progress, StartDeletionThread startDeletionThread) {
+    const Reporter report(needs_.log, replaceFunction);
     restoreUuid(progress);
     if (progress.swapped) {
         const auto moved = needs_.deathRow._moveItemAtURLToDeathRow(
@@ -262,8 +265,8 @@ std::optional<ZORError> Replace::cleanUpReplace(Progress& progress, StartDeletio
             topLevelOwnerOf(progress.newRecord->containerClass(), progress.newRecord->uid()));
         if (moved)
             return std::nullopt;
-        return makeError(needs_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
-                         LogFlag::yes, "Failed to remove staging dir: %s", progress.newUrl.c_str());
+        return report.error(ErrorCode::replaceCleanUpFailed, &moved.error(), "Failed to remove staging dir: %s",
+                            progress.newUrl.c_str());
     }
     if (!progress.hasMovedByJournal())
         return std::nullopt;
@@ -277,8 +280,8 @@ std::optional<ZORError> Replace::cleanUpReplace(Progress& progress, StartDeletio
     };
     const auto journalStays = [&](const ZORError& cause) {
         waits();
-        return makeError(needs_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &cause, LogFlag::yes,
-                         "Failed to remove replace file: %s", journalUrl.c_str());
+        return report.error(ErrorCode::replaceCleanUpFailed, &cause, "Failed to remove replace file: %s",
+                            journalUrl.c_str());
     };
     if (progress.oldWaits) {
         waits();
@@ -294,8 +297,8 @@ std::optional<ZORError> Replace::cleanUpReplace(Progress& progress, StartDeletio
     std::optional<ZORError> failed;
     if (const auto moved = needs_.deathRow._moveItemAtURLToDeathRow(progress.waitingUrl, StartDeletionThread::no);
         !moved)
-        failed = makeError(needs_.log, {replaceFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
-                           LogFlag::yes, "Failed to remove staging dir: %s", progress.waitingUrl.c_str());
+        failed = report.error(ErrorCode::replaceCleanUpFailed, &moved.error(), "Failed to remove staging dir: %s",
+                              progress.waitingUrl.c_str());
     const std::string journalName(journalUrl.lastPathComponent());
     if (const auto moved = needs_.deathRow._moveItemAtURLToDeathRow(journalUrl, startDeletionThread);
         !moved && needs_.fileManager.disk().unlinkFile(journals.get(), journalName.c_str()))

@@ -173,17 +173,18 @@ std::size_t ReplaceRecovery::journalCount() {
 
 Result<void> ReplaceRecovery::recoverReplace(const FileURL& journalUrl, ReplaceJournal* journal) {
     const Log& log = needs_.log;
+    const Reporter report(log, recoverFunction);
     if (journal) {
         journal->moveToRoot(needs_.fileManager.resolver().root().canonicalPath(),
                             needs_.configuration.stagingDirectory());
         if (log.writes(logLevelDebug))
-            log.write(logLevelDebug, recoverFunction, "Doing a replace of %s with info: %s", journalUrl.c_str(),
-                      journal->text().c_str());
+            report.write(logLevelDebug, "Doing a replace of %s with info: %s", journalUrl.c_str(),
+                         journal->text().c_str());
         TRY(applyReplaceJournal(*journal));
     }
     if (const auto moved = needs_.deathRow._moveItemAtURLToDeathRow(journalUrl, StartDeletionThread::no); !moved)
-        return makeError(log, {recoverFunction, __LINE__}, ErrorCode::replaceCleanUpFailed, &moved.error(),
-                         LogFlag::yes, "Failed to remove replace file at %s", journalUrl.c_str());
+        return report.error(ErrorCode::replaceCleanUpFailed, &moved.error(), "Failed to remove replace file at %s",
+                            journalUrl.c_str());
     waiting_.remove(journalUrl);
     return {};
 }
@@ -191,9 +192,9 @@ Result<void> ReplaceRecovery::recoverReplace(const FileURL& journalUrl, ReplaceJ
 Result<void> ReplaceRecovery::applyReplaceJournal(const ReplaceJournal& journal) {
     const Log& log = needs_.log;
     const auto failed = [&](const ZORError* cause) {
-        return makeError(log, {recoverFunction, __LINE__}, ErrorCode::journalUnusable, cause, LogFlag::yes,
-                         "Failed to recover replace move: %s to %s", journal.waitingUrl().c_str(),
-                         journal.oldUrl.c_str());
+        return Reporter(log, recoverFunction)
+            .error(ErrorCode::journalUnusable, cause, "Failed to recover replace move: %s to %s",
+                   journal.waitingUrl().c_str(), journal.oldUrl.c_str());
     };
     // A place that cannot be examined may hold a container or not. The journal waits for a launch that can tell.
     const State* const state = stateOf(needs_.fileManager, journal);
@@ -323,10 +324,10 @@ Result<void> ReplaceRecovery::listReplacesAgain(const ContainerAtStake& atStake)
         !staged || std::ranges::any_of(*staged, [&](const FileURL& url) { return mayComeBack(url, {}, atStake); });
     if (!mayBeOne)
         return {};
-    return makeError(needs_.log, {"settleReplaces", __LINE__}, ErrorCode::journalUnusable,
-                     staged ? &journals.error() : &staged.error(), LogFlag::yes,
-                     "A container of %s in %s may come back from %s, and the journals cannot be listed",
-                     ZOR_SHOWN(atStake.identifier), className(atStake.containerClass), staging.c_str());
+    return Reporter(needs_.log, "settleReplaces")
+        .error(ErrorCode::journalUnusable, staged ? &journals.error() : &staged.error(),
+               "A container of %s in %s may come back from %s, and the journals cannot be listed",
+               ZOR_SHOWN(atStake.identifier), className(atStake.containerClass), staging.c_str());
 }
 
 Result<std::shared_ptr<ZORMetadata>> ReplaceRecovery::settledContainer(std::uint32_t userId,

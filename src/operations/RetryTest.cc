@@ -7,16 +7,15 @@ namespace zor {
 
 Result<void> RetryTest::retryTestForUser(const Caller& caller, std::uint32_t userId, std::uint64_t numCrashes) {
     return needs_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
-        constexpr const char* function = "retryTestForUser";
+        const Reporter report(needs_.log, "retryTestForUser");
         static const std::string identifier = "com.veltra.retryTest";
         static const std::string counterKey = "CrashCounter";
-        const Log& log = needs_.log;
         const auto found =
             needs_.creation.createOrLookupContainerForUser(caller, userId, &identifier, ContainerClass::dataApplication,
                                                            {.createIfNecessary = true, .transient = false});
         if (!found) {
-            log.write(logLevelError, function,
-                      "Failed to create or lookup lookup existing container for retry test: %s", identifier.c_str());
+            report.write(logLevelError, "Failed to create or lookup lookup existing container for retry test: %s",
+                         identifier.c_str());
             return found.error();
         }
         const ContainerAddress address{.userId = userId,
@@ -29,20 +28,20 @@ Result<void> RetryTest::retryTestForUser(const Caller& caller, std::uint32_t use
             // A 0 stays behind when the last staging failed: nothing is left to be counted down.
             remaining = counter == 0 ? 0 : counter - 1;
         }
-        log.write(logLevelError, function, "Crashes Remaining in retry test: %llu",
-                  static_cast<unsigned long long>(remaining));
+        report.write(logLevelError, "Crashes Remaining in retry test: %llu",
+                     static_cast<unsigned long long>(remaining));
         const plist::Value value(remaining);
         TRY(needs_.infoValues.setInfoValue(caller, &value, &counterKey, address));
         if (remaining != 0) {
-            log.write(logLevelError, function, "Crashing");
+            report.write(logLevelError, "Crashing");
             ::_exit(0);
         }
         auto staged = needs_.deletion.stageForDeleteContainersWithUsers(
             DeletionBatch::of(userId, found->uuid, identifier, ContainerClass::dataApplication));
         if (staged)
-            log.write(logLevelError, function, "Returning Successfully");
+            report.write(logLevelError, "Returning Successfully");
         else
-            log.write(logLevelError, function, "Failed to delete retry container at : %s", found->path.c_str());
+            report.write(logLevelError, "Failed to delete retry container at : %s", found->path.c_str());
         return staged;
     });
 }

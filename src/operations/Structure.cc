@@ -28,8 +28,9 @@ Result<void> Structure::recreateDefaultStructureForUser(const ContainerAddress& 
                                    record->recordedProtectionClass().value_or(protectionClassUnchanged), changed));
         }
         if (const auto failed = needs_.moves.syncDirectories(changed))
-            return makeError(needs_.log, {function, __LINE__}, ErrorCode::subdirectoryFailed, &*failed, LogFlag::yes,
-                             "Failed to create sub-dir at %s%s", changed.front().c_str(), "");
+            return Reporter(needs_.log, function)
+                .error(ErrorCode::subdirectoryFailed, &*failed, "Failed to create sub-dir at %s%s",
+                       changed.front().c_str(), "");
         return {};
     });
 }
@@ -58,9 +59,9 @@ Result<void> Structure::makeSubdirectories(const ContainerLayout& layout, int pr
         changed.push_back(container.appendingDirectory(subdirectory));
         auto made = make(subdirectory);
         if (!made)
-            return makeError(needs_.log, {"_createSubDirectories", __LINE__}, ErrorCode::subdirectoryFailed,
-                             &made.error(), LogFlag::yes, "Failed to create sub-dir at %s%s", container.c_str(),
-                             subdirectory);
+            return Reporter(needs_.log, "_createSubDirectories")
+                .error(ErrorCode::subdirectoryFailed, &made.error(), "Failed to create sub-dir at %s%s",
+                       container.c_str(), subdirectory);
         open.emplace(subdirectory, std::move(*made));
     }
     return {};
@@ -99,9 +100,9 @@ Result<void> Structure::regenerate(const ContainerAddress& address) {
             return {};
         }();
         if (!moved)
-            return makeError(needs_.log, {function, __LINE__}, ErrorCode::directoryNotRenamed, &moved.error(),
-                             LogFlag::yes, "Failed to move dir: %s to new UUID dir: %s", oldUrl.c_str(),
-                             newUrl.c_str());
+            return Reporter(needs_.log, function)
+                .error(ErrorCode::directoryNotRenamed, &moved.error(), "Failed to move dir: %s to new UUID dir: %s",
+                       oldUrl.c_str(), newUrl.c_str());
         const bool transient = record->transient(); // the mapping is the live one's
         if (isPerUserClass(address.containerClass) && !transient &&
             !needs_.mappings._setSandboxContainerMappingForUser(address.userId, record->identifier(),
@@ -110,9 +111,9 @@ Result<void> Structure::regenerate(const ContainerAddress& address) {
         record->setDurable(false);
         const auto added = needs_.cache.addContainerMetadata(record, address.userId, ContainerPlace(newUrl), transient);
         if (!added)
-            return makeError(needs_.log, {function, __LINE__}, ErrorCode::cacheAddFailed, &added.error(), LogFlag::yes,
-                             "Failed to add to cache: %s, url: %s, transient: %d", ZOR_SHOWN(record->identifier()),
-                             newUrl.c_str(), transient);
+            return Reporter(needs_.log, function)
+                .error(ErrorCode::cacheAddFailed, &added.error(), "Failed to add to cache: %s, url: %s, transient: %d",
+                       ZOR_SHOWN(record->identifier()), newUrl.c_str(), transient);
         renamed = record;
     }
     if (const auto failed = needs_.moves.syncDirectories({newUrl.deletingLastPathComponent()}))

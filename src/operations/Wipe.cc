@@ -38,21 +38,22 @@ Result<void> Wipe::checkWipe(const Caller& caller, std::uint32_t userId, const s
 
 Result<void> Wipe::deleteDataContainerContentForUser(const Caller& caller, std::uint32_t userId,
                                                      const std::string* identifier, ContainerClass containerClass) {
+    const Reporter report(needs_.log, function);
     return needs_.boundary.run({function, __LINE__}, [&]() -> Result<void> {
         TRY(checkWipe(caller, userId, identifier, containerClass));
         const auto old = needs_.creation.createOrLookupContainerForUser(
             caller, userId, identifier, containerClass, {.createIfNecessary = false, .transient = false});
         if (!old) {
-            needs_.log.write(logLevelError, function, "Failed to lookup existing container to wipe-identifier: %s",
-                             ZOR_SHOWN(*identifier));
+            report.write(logLevelError, "Failed to lookup existing container to wipe-identifier: %s",
+                         ZOR_SHOWN(*identifier));
             return old.error();
         }
         const auto fresh = needs_.creation.createOrLookupContainerForUser(
             caller, userId, identifier, containerClass,
             {.createIfNecessary = true, .transient = true, .replacesAnother = true});
         if (!fresh) {
-            needs_.log.write(logLevelError, function, "Failed to create transient container for wipe-identifier: %s",
-                             ZOR_SHOWN(*identifier));
+            report.write(logLevelError, "Failed to create transient container for wipe-identifier: %s",
+                         ZOR_SHOWN(*identifier));
             return fresh.error();
         }
         auto replaced = needs_.replace.replaceContainer({.oldUuid = old->uuid,
@@ -66,7 +67,7 @@ Result<void> Wipe::deleteDataContainerContentForUser(const Caller& caller, std::
                                                          .preserveOldUuid = PreserveOldUUID::yes},
                                                         StartDeletionThread::yes);
         if (!replaced)
-            needs_.log.write(logLevelError, function, "Failed replace operation during delete all content");
+            report.write(logLevelError, "Failed replace operation during delete all content");
         return replaced;
     });
 }

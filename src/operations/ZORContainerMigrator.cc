@@ -71,9 +71,9 @@ ZORContainerMigrator::Outcome ZORContainerMigrator::performMigrationWithError() 
                                failure.text());
     if (!owned)
         return {.succeeded = false,
-                .error = makeError(log, {migrationFunction, __LINE__}, ErrorCode::ownerNotChanged, &owned.error(),
-                                   LogFlag::yes, "Failed to change owner of %s: %s", bundles.c_str(),
-                                   owned.error().text().c_str()),
+                .error = Reporter(log, migrationFunction)
+                             .error(ErrorCode::ownerNotChanged, &owned.error(), "Failed to change owner of %s: %s",
+                                    bundles.c_str(), owned.error().text().c_str()),
                 .migrated = count.migrated};
     if (count.unfinished != 0) {
         log.write(
@@ -236,28 +236,28 @@ void ZORContainerMigrator::adoptBundlesOfClass(ContainerClass containerClass, Co
 
 Result<void> ZORContainerMigrator::adoptBundle(const FileURL& container) {
     const Log& log = needs_.log;
+    const Reporter report(log, migrationFunction);
     // Its owner was the mobile user, and so, perhaps, was its metadata file's.
     const auto read =
         readAndValidateMetadataAtUrl(log, needs_.fileManager, container, needs_.configuration.users().first,
                                      CheckClassPath::yes, needs_.configuration.users().first);
     if (!read) {
-        log.write(logLevelError, migrationFunction, "Failed to read metadata at URL %s : %s", container.c_str(),
-                  read.error().text().c_str());
+        report.write(logLevelError, "Failed to read metadata at URL %s : %s", container.c_str(),
+                     read.error().text().c_str());
         return read.error();
     }
     const auto& record = *read;
     record->setUid(needs_.configuration.users().installer);
     const auto written = record->writeMetadataToDiskWithError(log, needs_.fileManager);
     if (!written)
-        return makeError(log, {migrationFunction, __LINE__}, ErrorCode::propertyListNotWritten, &written.error(),
-                         LogFlag::yes, "Failed to write metadata for %u : %s, url: %s",
-                         needs_.configuration.users().installer, ZOR_SHOWN(record->identifier()), container.c_str());
+        return report.error(ErrorCode::propertyListNotWritten, &written.error(),
+                            "Failed to write metadata for %u : %s, url: %s", needs_.configuration.users().installer,
+                            ZOR_SHOWN(record->identifier()), container.c_str());
     const auto added =
         needs_.cache.addContainerMetadata(record, needs_.configuration.users().installer, record->place(), false);
     if (!added)
-        return makeError(log, {migrationFunction, __LINE__}, ErrorCode::cacheAddFailed, &added.error(), LogFlag::yes,
-                         "Failed to add to cache for %u : %s, url: %s", needs_.configuration.users().installer,
-                         ZOR_SHOWN(record->identifier()), container.c_str());
+        return report.error(ErrorCode::cacheAddFailed, &added.error(), "Failed to add to cache for %u : %s, url: %s",
+                            needs_.configuration.users().installer, ZOR_SHOWN(record->identifier()), container.c_str());
     return {};
 }
 
@@ -305,7 +305,7 @@ bool ZORContainerMigrator::migrateWellknownOfClass(ContainerClass containerClass
 
 Result<bool> ZORContainerMigrator::migrateWellknown(const std::shared_ptr<ZORMetadata>& record,
                                                     ContainerClass containerClass, const FileURL& classDirectory) {
-    const Log& log = needs_.log;
+    const Reporter report(needs_.log, whitelistFunction);
     const std::string& identifier = record->identifier();
     if (identifier.empty() || !record->hasUrl() || !needs_.whitelist.containerIdIsWellknown(identifier, containerClass))
         return false;
@@ -314,13 +314,12 @@ Result<bool> ZORContainerMigrator::migrateWellknown(const std::shared_ptr<ZORMet
     const FileURL former = record->url();
     if (former == target)
         return false;
-    log.write(logLevelError, whitelistFunction, "Migrating well-known container %s", ZOR_SHOWN(identifier));
+    report.write(logLevelError, "Migrating well-known container %s", ZOR_SHOWN(identifier));
     auto removed =
         needs_.cache.removeContainerForUser(needs_.configuration.users().system, containerClass, &identifier, false);
     if (!removed) {
-        log.write(logLevelError, whitelistFunction,
-                  "%s: Failed to remove cache for whitelisted container %s: (error= %s: %lld)", whitelistOperation,
-                  ZOR_SHOWN(identifier), removed.error().domainName(), code(removed.error()));
+        report.write(logLevelError, "%s: Failed to remove cache for whitelisted container %s: (error= %s: %lld)",
+                     whitelistOperation, ZOR_SHOWN(identifier), removed.error().domainName(), code(removed.error()));
         return std::move(removed).error();
     }
     auto moved = [&]() -> Result<void> {
@@ -329,18 +328,17 @@ Result<bool> ZORContainerMigrator::migrateWellknown(const std::shared_ptr<ZORMet
         return {};
     }();
     if (!moved) {
-        log.write(logLevelError, whitelistFunction,
-                  "%s: Failed to move system container %s from %s to whitelisted location %s: (error= %s: %lld)",
-                  whitelistOperation, ZOR_SHOWN(identifier), former.c_str(), target.c_str(), moved.error().domainName(),
-                  code(moved.error()));
+        report.write(logLevelError,
+                     "%s: Failed to move system container %s from %s to whitelisted location %s: (error= %s: %lld)",
+                     whitelistOperation, ZOR_SHOWN(identifier), former.c_str(), target.c_str(),
+                     moved.error().domainName(), code(moved.error()));
         return std::move(moved).error();
     }
     auto added =
         needs_.cache.addContainerMetadata(record, needs_.configuration.users().system, ContainerPlace(target), false);
     if (!added) {
-        log.write(logLevelError, whitelistFunction,
-                  "%s: Failed to update cache for whitelisted container %s: (error= %s: %lld)", whitelistOperation,
-                  ZOR_SHOWN(identifier), added.error().domainName(), code(added.error()));
+        report.write(logLevelError, "%s: Failed to update cache for whitelisted container %s: (error= %s: %lld)",
+                     whitelistOperation, ZOR_SHOWN(identifier), added.error().domainName(), code(added.error()));
         return std::move(added).error();
     }
     return true;

@@ -99,6 +99,7 @@ Result<ZORDataProtectionChangeOperation::NeedRetry> ZORDataProtectionChangeOpera
 }
 
 void ZORDataProtectionChangeOperation::conclude(const Result<NeedRetry>& attempted) {
+    const Reporter report(needs_.log, performFunction);
     const ZORMetadata& container = *dataContainerMetadata_;
     const bool locked = attempted && *attempted == NeedRetry::yes;
     if (locked && retryIfLocked_ == RetryIfLocked::yes)
@@ -106,19 +107,18 @@ void ZORDataProtectionChangeOperation::conclude(const Result<NeedRetry>& attempt
     std::optional<ZORError> error;
     if (!attempted) {
         error = attempted.error();
-        needs_.log.write(logLevelNotice, performFunction,
-                         "Operation to update protection classes for user: %u, id: %s, containerClass: %llu to "
-                         "class %d failed with error %s",
-                         container.uid(), ZOR_SHOWN(container.identifier()), number(container.containerClass()),
-                         newDataProtectionClass_, error->text().c_str());
+        report.write(logLevelNotice,
+                     "Operation to update protection classes for user: %u, id: %s, containerClass: %llu to "
+                     "class %d failed with error %s",
+                     container.uid(), ZOR_SHOWN(container.identifier()), number(container.containerClass()),
+                     newDataProtectionClass_, error->text().c_str());
     }
     if (locked)
-        error =
-            makeError(needs_.log, {performFunction, __LINE__}, ErrorCode::lockedAndNotRetried, nullptr, LogFlag::yes,
-                      "Tried to update user: %u, id: %s, containerClass: %llu to protection class %d, but was "
-                      "locked and didn't retry",
-                      container.uid(), ZOR_SHOWN(container.identifier()), number(container.containerClass()),
-                      newDataProtectionClass_);
+        error = report.error(ErrorCode::lockedAndNotRetried,
+                             "Tried to update user: %u, id: %s, containerClass: %llu to protection class %d, but was "
+                             "locked and didn't retry",
+                             container.uid(), ZOR_SHOWN(container.identifier()), number(container.containerClass()),
+                             newDataProtectionClass_);
     if (completionBlock_)
         completionBlock_(locked, error);
 }
@@ -161,9 +161,10 @@ Result<ZORDataProtectionChangeOperation::NeedRetry> ZORDataProtectionChangeOpera
 }
 
 ZORError ZORDataProtectionChangeOperation::changedMeanwhile() {
-    return makeError(needs_.log, {passFunction, __LINE__}, ErrorCode::pathNotAsExpected, nullptr, LogFlag::yes,
-                     "Cancelling data protection operation because container path changed on disk. This indicates "
-                     "the app may have been updated and changed its protection level.");
+    return Reporter(needs_.log, passFunction)
+        .error(ErrorCode::pathNotAsExpected,
+               "Cancelling data protection operation because container path changed on disk. This indicates "
+               "the app may have been updated and changed its protection level.");
 }
 
 Result<void> ZORDataProtectionChangeOperation::checkStillThere(const IdentifierLock& held) {
@@ -173,10 +174,11 @@ Result<void> ZORDataProtectionChangeOperation::checkStillThere(const IdentifierL
     const auto found =
         needs_.cache.containerForUser(container.uid(), container.containerClass(), &container.identifier(), false);
     if (!found)
-        return makeError(needs_.log, {passFunction, __LINE__}, ErrorCode::notFound, &found.error(), LogFlag::yes,
-                         "Failed to lookup container to set data protection for userId: %u, identifier: %s, Class: "
-                         "%llu",
-                         container.uid(), ZOR_SHOWN(container.identifier()), number(container.containerClass()));
+        return Reporter(needs_.log, passFunction)
+            .error(ErrorCode::notFound, &found.error(),
+                   "Failed to lookup container to set data protection for userId: %u, identifier: %s, Class: "
+                   "%llu",
+                   container.uid(), ZOR_SHOWN(container.identifier()), number(container.containerClass()));
     const auto same = needs_.cache.containerForUser(container.uid(), container.containerClass(),
                                                     &container.identifier(), container.uuid().string());
     if (!same || !*same || (*same)->transient() || (*same)->url() != container.url())
@@ -314,20 +316,20 @@ Result<void> ZORDataProtectionChangeOperation::changeFile(const OpenFile& file) 
 Result<void>
 ZORDataProtectionChangeOperation::setClass(const std::string& path, std::int32_t target, const Declines& declines,
                                            const std::function<Result<void>(const Declines& predicate)>& set) {
+    const Reporter report(needs_.log, passFunction);
     mode_t mode = 0;
     auto done = set([&](const struct stat& status, int current) {
         mode = status.st_mode;
         if (declines(status, current))
             return false;
         if (needs_.log.writes(logLevelDebug))
-            needs_.log.write(logLevelDebug, passFunction, "Setting protection class of %s to %d", ZOR_SHOWN(path),
-                             target);
+            report.write(logLevelDebug, "Setting protection class of %s to %d", ZOR_SHOWN(path), target);
         return true;
     });
     if (done || !done.error().isPosix(EBADF))
         return done;
-    needs_.log.write(logLevelError, passFunction, "Ignoring failure to set protection class to %d on %s (mode 0%o): %s",
-                     target, ZOR_SHOWN(path), mode, done.error().text().c_str());
+    report.write(logLevelError, "Ignoring failure to set protection class to %d on %s (mode 0%o): %s", target,
+                 ZOR_SHOWN(path), mode, done.error().text().c_str());
     return {};
 }
 

@@ -63,22 +63,22 @@ std::unique_ptr<ZORApplicationTerminationAssertion>
 ZORApplicationTerminationAssertion::initWithBundleIdentifier(const Log& log,
                                                              platform::TerminationAssertionService& service,
                                                              const std::string& bundleIdentifier, std::uint8_t reason) {
+    const Reporter report(log, initFunction);
     const auto acquisition = std::make_shared<Acquisition>();
     if (!acquisition->usable()) {
-        log.write(logLevelError, initFunction, "Failed to create completion semaphore: %s", Errno::last().text());
+        report.write(logLevelError, "Failed to create completion semaphore: %s", Errno::last().text());
         return nullptr;
     }
-    Handle handle = service.acquire(bundleIdentifier, reasonOf(log, reason),
-                                    [&log, acquisition, bundleIdentifier](const std::optional<std::string>& error) {
-                                        if (error)
-                                            log.write(logLevelError, initFunction,
-                                                      "Failed to acquire termination assertion for %s : %s",
-                                                      ZOR_SHOWN(bundleIdentifier), error->c_str());
-                                        acquisition->answer(!error);
-                                    });
+    Handle handle =
+        service.acquire(bundleIdentifier, reasonOf(log, reason),
+                        [report, acquisition, bundleIdentifier](const std::optional<std::string>& error) {
+                            if (error)
+                                report.write(logLevelError, "Failed to acquire termination assertion for %s : %s",
+                                             ZOR_SHOWN(bundleIdentifier), error->c_str());
+                            acquisition->answer(!error);
+                        });
     if (!handle) {
-        log.write(logLevelError, initFunction, "No termination assertion could be obtained for %s",
-                  ZOR_SHOWN(bundleIdentifier));
+        report.write(logLevelError, "No termination assertion could be obtained for %s", ZOR_SHOWN(bundleIdentifier));
         return nullptr;
     }
     if (!acquisition->wait())
@@ -196,32 +196,32 @@ ZORDataProtectionManager::prepare(const Request& request, const Completion& comp
 }
 
 Result<std::shared_ptr<const ZORMetadata>> ZORDataProtectionManager::containerOf(const Request& request) {
+    const Reporter report(needs_.log, function);
     if (!request.identifier || !isPerUserClass(request.containerClass))
-        return makeError(needs_.log, {function, __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                         "Can't act on an invalid object: userId: %u, ID: %s, class: %ld", request.userId,
-                         ZOR_SHOWN(request.identifier), static_cast<long>(request.containerClass));
+        return report.error(ErrorCode::invalidObject, "Can't act on an invalid object: userId: %u, ID: %s, class: %ld",
+                            request.userId, ZOR_SHOWN(request.identifier), static_cast<long>(request.containerClass));
     needs_.cache.prepare(request.userId, request.containerClass, false);
     // Records are shared: what this change goes by is copied while nobody can change it.
     const AllIdentifiersLock lock(needs_.locks, LockMode::reading);
     const auto record =
         needs_.cache.containerForUser(request.userId, request.containerClass, &*request.identifier, false);
     if (!record)
-        return makeError(needs_.log, {function, __LINE__}, ErrorCode::notFound, &record.error(), LogFlag::yes,
-                         "No Container with userId: %u, identifier: %s, Class: %ld", request.userId,
-                         ZOR_SHOWN(request.identifier), static_cast<long>(request.containerClass));
+        return report.error(ErrorCode::notFound, &record.error(),
+                            "No Container with userId: %u, identifier: %s, Class: %ld", request.userId,
+                            ZOR_SHOWN(request.identifier), static_cast<long>(request.containerClass));
     const ZORMetadata& found = **record;
     return std::make_shared<const ZORMetadata>(found.uid(), found.uuid(), found.containerClass(), found.identifier(),
                                                found.info(), found.place());
 }
 
 Result<void> ZORDataProtectionManager::checkClass(const Request& request) {
+    const Reporter report(needs_.log, function);
     const int requested = request.dataProtectionClass;
     if (requested == classNeverAllowed)
-        return makeError(needs_.log, {function, __LINE__}, ErrorCode::valueNotAllowed, nullptr, LogFlag::yes,
-                         "Data protection class %d is not allowed", requested);
+        return report.error(ErrorCode::valueNotAllowed, "Data protection class %d is not allowed", requested);
     if (request.isSecondOrThirdPartyApp && (requested < 0 || requested > classMaxOfOthers))
-        return makeError(needs_.log, {function, __LINE__}, ErrorCode::valueNotAllowed, nullptr, LogFlag::yes,
-                         "Data protection class %d is invalid for 2nd and 3rd party apps", requested);
+        return report.error(ErrorCode::valueNotAllowed,
+                            "Data protection class %d is invalid for 2nd and 3rd party apps", requested);
     return {};
 }
 
@@ -232,19 +232,20 @@ Result<void> ZORDataProtectionManager::checkBound(const Request& request) {
     }();
     if (request.byOwner || changes < needs_.limits.protectionChangesMax)
         return {};
-    return makeError(needs_.log, {function, __LINE__}, ErrorCode::lockedAndNotRetried, nullptr, LogFlag::yes,
-                     "%llu changes of protection wait already, and no more may; ask again after an unlock",
-                     static_cast<unsigned long long>(changes));
+    return Reporter(needs_.log, function)
+        .error(ErrorCode::lockedAndNotRetried,
+               "%llu changes of protection wait already, and no more may; ask again after an unlock",
+               static_cast<unsigned long long>(changes));
 }
 
 void ZORDataProtectionManager::finish(Change& change, bool wasLocked, const std::optional<ZORError>& error) {
+    const Reporter report(needs_.log, function);
     if (error)
-        needs_.log.write(logLevelError, function,
-                         "Failed to set data protection on container with identifier %s at %s to %d: %s",
-                         ZOR_SHOWN(change.container->identifier()), change.container->url().c_str(),
-                         change.request.dataProtectionClass, error->text().c_str());
+        report.write(logLevelError, "Failed to set data protection on container with identifier %s at %s to %d: %s",
+                     ZOR_SHOWN(change.container->identifier()), change.container->url().c_str(),
+                     change.request.dataProtectionClass, error->text().c_str());
     if (wasLocked && change.request.retryIfLocked)
-        needs_.log.write(logLevelError, function, "Unexpectedly got completion block called with wasLocked");
+        report.write(logLevelError, "Unexpectedly got completion block called with wasLocked");
     change.dropAssertion();
     change.end();
     change.completion(error ? error->replyCode() : ErrorCode::success);

@@ -217,8 +217,9 @@ Result<ZORGroupManager::Paths> ZORGroupManager::groupContainerPathsForUser(std::
     constexpr Here here{"groupContainerPathsForUser", __LINE__};
     return needs_.boundary.run(here, [&]() -> Result<Paths> {
         if (!identifier)
-            return makeError(needs_.log, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                             "Can't act on an invalid object: userId: %u, ID: %s", userId, "(null)");
+            return Reporter(needs_.log, here.function)
+                .error({ErrorCode::invalidObject, here.line}, "Can't act on an invalid object: userId: %u, ID: %s",
+                       userId, "(null)");
         const auto groupFailed = [&](const ZORError& error) {
             needs_.log.write(logLevelError, here.function,
                              "Failed to create or lookup group container-userId: %u, ID: %s : %llu", userId,
@@ -242,8 +243,9 @@ Result<std::vector<std::string>> ZORGroupManager::groupContainerIdentifiersForUs
     constexpr Here here{"groupContainerIdentifiersForUser", __LINE__};
     return needs_.boundary.run(here, [&]() -> Result<std::vector<std::string>> {
         if (!identifier)
-            return makeError(needs_.log, here, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-                             "Can't act on an invalid object: userId: %u, ID: %s", userId, "(null)");
+            return Reporter(needs_.log, here.function)
+                .error({ErrorCode::invalidObject, here.line}, "Can't act on an invalid object: userId: %u, ID: %s",
+                       userId, "(null)");
         const AllIdentifiersWriteLock lock(needs_.locks);
         return needs_.entitlements.appGroupIdentifiersForIdentifier(*identifier).value_or(std::vector<std::string>());
     });

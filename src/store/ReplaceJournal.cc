@@ -47,10 +47,11 @@ std::string_view ReplaceJournal::stagingNameFor(const FileURL& url) {
 
 Result<void> ReplaceJournal::_writeToDiskReplaceAt(const Log& log, ZORFileManager& fileManager,
                                                    const FileURL& url) const {
+    const Reporter report(log, __func__);
     if (oldUrl.empty() || newUrl.empty() || stagingUrl.empty() || destUrl.empty())
-        return makeError(log, ZOR_HERE, ErrorCode::journalValuesInvalid, nullptr, LogFlag::yes,
-                         "Invalid Replace File Info: old: %s, new: %s, staging: %s, dest: %s", oldUrl.c_str(),
-                         newUrl.c_str(), stagingUrl.c_str(), destUrl.c_str());
+        return report.error(ErrorCode::journalValuesInvalid,
+                            "Invalid Replace File Info: old: %s, new: %s, staging: %s, dest: %s", oldUrl.c_str(),
+                            newUrl.c_str(), stagingUrl.c_str(), destUrl.c_str());
     plist::Dictionary content{{std::string(oldKey), oldUrl.path()},
                               {std::string(newKey), newUrl.path()},
                               {std::string(stagingKey), stagingUrl.path()},
@@ -60,26 +61,27 @@ Result<void> ReplaceJournal::_writeToDiskReplaceAt(const Log& log, ZORFileManage
     const auto written =
         writeToURL(content, url, writeAtomically | writeWithoutProtection, journalBytesMax, fileManager);
     if (!written)
-        return makeError(log, ZOR_HERE, ErrorCode::propertyListNotWritten, &written.error(), LogFlag::yes,
-                         "Failed to write replace dictionary to URL %s", url.c_str());
+        return report.error(ErrorCode::propertyListNotWritten, &written.error(),
+                            "Failed to write replace dictionary to URL %s", url.c_str());
     return {};
 }
 
 Result<ReplaceJournal> ReplaceJournal::_readAndValidateReplaceFileAtUrl(const Log& log, ZORFileManager& fileManager,
                                                                         const FileURL& url) {
+    const Reporter report(log, __func__);
     const auto content = readDictionaryAtURL(url, journalBytesMax, fileManager);
     if (!content)
-        return makeError(log, ZOR_HERE, ErrorCode::journalUnusable, &content.error(), LogFlag::yes,
-                         "Failed to read replace file at URL %s", url.c_str());
+        return report.error(ErrorCode::journalUnusable, &content.error(), "Failed to read replace file at URL %s",
+                            url.c_str());
     std::array<FileURL, 4> urls;
     const std::array keys = {oldKey, newKey, stagingKey, destKey};
     for (std::size_t i = 0; i < keys.size(); ++i) {
         const std::string* path = content->string(keys[i]);
         if (!isPlace(path))
-            return makeError(log, ZOR_HERE, ErrorCode::journalUnusable, nullptr, LogFlag::yes,
-                             "Invalid replace data: Old: %s, New: %s, Staging: %s, Dest: %s",
-                             shownOf(*content, oldKey).c_str(), shownOf(*content, newKey).c_str(),
-                             shownOf(*content, stagingKey).c_str(), shownOf(*content, destKey).c_str());
+            return report.error(ErrorCode::journalUnusable,
+                                "Invalid replace data: Old: %s, New: %s, Staging: %s, Dest: %s",
+                                shownOf(*content, oldKey).c_str(), shownOf(*content, newKey).c_str(),
+                                shownOf(*content, stagingKey).c_str(), shownOf(*content, destKey).c_str());
         urls[i] = FileURL::directory(*path);
     }
     const std::string* const aside = content->string(asideKey);

@@ -23,8 +23,9 @@ long number(ContainerClass containerClass) {
 } // namespace
 
 ZORError ZORContainerCache::failedToRebuild(Here here, const Key& key, const ZORError& cause) {
-    return makeError(log_, here, ErrorCode::cacheNotRebuilt, &cause, LogFlag::yes, "Cache: %u-%s%s: Failed to rebuild",
-                     key.userId, className(key.containerClass), suffix(key.transient));
+    return Reporter(log_, here.function)
+        .error(ErrorCode::cacheNotRebuilt, &cause, "Cache: %u-%s%s: Failed to rebuild", key.userId,
+               className(key.containerClass), suffix(key.transient));
 }
 
 void ZORContainerCache::traceIdentifier(Here here, const Key& key, const char* what, const std::string& identifier) {
@@ -96,9 +97,9 @@ Result<ZORContainerCache::Found> ZORContainerCache::findRecord(const Key& key, c
         found = (*cache)->records.find(std::string_view(identifier));
     }
     if (found == (*cache)->records.end())
-        return makeError(log_, {"containerForUser", __LINE__}, ErrorCode::notFound, nullptr, LogFlag::no,
-                         "Cache: %s%s: Container Not Found with ID: %s", className(key.containerClass),
-                         suffix(key.transient), ZOR_SHOWN(identifier));
+        return Reporter(log_, "containerForUser")
+            .unlogged(ErrorCode::notFound, "Cache: %s%s: Container Not Found with ID: %s",
+                      className(key.containerClass), suffix(key.transient), ZOR_SHOWN(identifier));
     return Found{.record = *found, .place = (*found)->place()};
 }
 
@@ -114,9 +115,9 @@ ErrnoOr<bool> ZORContainerCache::lookForFile(const FileURL& container) {
 Result<void> ZORContainerCache::checkOnDisk(Here here, const Key& key, const Found& found, const ErrnoOr<bool>& looked,
                                             const char* foundFormatPrefix) {
     if (found.place.empty())
-        return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
-                         "Cache: %s%s: nil URL from %s", className(key.containerClass), suffix(key.transient),
-                         "(null)");
+        return Reporter(log_, here.function)
+            .error(ErrorCode::cacheInputInvalid, "Cache: %s%s: nil URL from %s", className(key.containerClass),
+                   suffix(key.transient), "(null)");
     if (looked.value_or(false)) {
         traceIdentifier(here, key, foundFormatPrefix, found.record->identifier());
         return {};
@@ -132,9 +133,10 @@ Result<void> ZORContainerCache::checkOnDisk(Here here, const Key& key, const Fou
     std::optional<ZORError> cause;
     if (isOwnShortage(missing))
         cause = posixError(here, missing, "open of %s failed: %s", file.c_str(), missing.text());
-    return makeError(log_, here, ErrorCode::cachedContainerWithoutMetadata, cause ? &*cause : nullptr, LogFlag::yes,
-                     "Cache: %s%s: INCONSISTENT-No Metadata at: %s", className(key.containerClass),
-                     suffix(key.transient), file.c_str());
+    return Reporter(log_, here.function)
+        .error(ErrorCode::cachedContainerWithoutMetadata, cause ? &*cause : nullptr,
+               "Cache: %s%s: INCONSISTENT-No Metadata at: %s", className(key.containerClass), suffix(key.transient),
+               file.c_str());
 }
 
 Result<ZORContainerCache::Record> ZORContainerCache::containerForUser(std::uint32_t userId,
@@ -143,11 +145,11 @@ Result<ZORContainerCache::Record> ZORContainerCache::containerForUser(std::uint3
     return boundary_.run(ZOR_HERE, [&]() -> Result<Record> {
         const Here here{"containerForUser", __LINE__};
         if (!isValidClass(containerClass))
-            return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
-                             "Invalid Content Class: %ld", number(containerClass));
+            return Reporter(log_, here.function)
+                .error(ErrorCode::cacheInputInvalid, "Invalid Content Class: %ld", number(containerClass));
         if (!identifier)
-            return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes, "Invalid identifier: %s",
-                             "(null)");
+            return Reporter(log_, here.function)
+                .error(ErrorCode::cacheInputInvalid, "Invalid identifier: %s", "(null)");
         const Key key{userId, containerClass, transient};
         return withCurrentHome(key, [&] { return findOnDisk(here, key, *identifier); });
     });
@@ -187,9 +189,9 @@ Result<ZORContainerCache::Record> ZORContainerCache::findOnDisk(Here here, const
                                                                 const std::string& identifier) {
     Found found = TRY(findRecord(key, identifier));
     if (found.place.empty())
-        return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
-                         "Cache: %s%s: Invalid URL path string: %s", className(key.containerClass),
-                         suffix(key.transient), "(null)");
+        return Reporter(log_, here.function)
+            .error(ErrorCode::cacheInputInvalid, "Cache: %s%s: Invalid URL path string: %s",
+                   className(key.containerClass), suffix(key.transient), "(null)");
     auto looked = lookForFile(found.place.url());
     if (!looked && looked.error() == ENOENT && lookOver(key, found)) {
         found = TRY(findRecord(key, identifier));
@@ -222,8 +224,8 @@ Result<std::vector<ZORContainerCache::Record>> ZORContainerCache::listed(const K
     return boundary_.run(ZOR_HERE, [&]() -> Result<std::vector<Record>> {
         const Here here{"allContainersForUser", __LINE__};
         if (!isValidClass(key.containerClass))
-            return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
-                             "Invalid Content Class: %ld", number(key.containerClass));
+            return Reporter(log_, here.function)
+                .error(ErrorCode::cacheInputInvalid, "Invalid Content Class: %ld", number(key.containerClass));
         return withCurrentHome(key, [&]() -> Result<std::vector<Record>> {
             std::vector<Found> found;
             std::uint64_t homeGeneration = 0;
@@ -324,11 +326,12 @@ Result<void> ZORContainerCache::addContainerMetadata(const Record& record, std::
     return boundary_.run(ZOR_HERE, [&]() -> Result<void> {
         const Here here{"addContainerMetadata", __LINE__};
         if (!isValidClass(record->containerClass()))
-            return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
-                             "Invalid Metadata Content Class: %lld", static_cast<long long>(record->containerClass()));
+            return Reporter(log_, here.function)
+                .error(ErrorCode::cacheInputInvalid, "Invalid Metadata Content Class: %lld",
+                       static_cast<long long>(record->containerClass()));
         if (place.empty())
-            return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes, "Invalid input: URL: %s",
-                             "(null)");
+            return Reporter(log_, here.function)
+                .error(ErrorCode::cacheInputInvalid, "Invalid input: URL: %s", "(null)");
         const Key key{userId, record->containerClass(), transient};
         const std::size_t infoBytes = infoBytesOf(*record);
         {
@@ -350,11 +353,11 @@ Result<void> ZORContainerCache::removeContainerForUser(std::uint32_t userId, Con
     return boundary_.run(ZOR_HERE, [&]() -> Result<void> {
         const Here here{"removeContainerForUser", __LINE__};
         if (!isValidClass(containerClass))
-            return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
-                             "Invalid Content Class: %ld", number(containerClass));
+            return Reporter(log_, here.function)
+                .error(ErrorCode::cacheInputInvalid, "Invalid Content Class: %ld", number(containerClass));
         if (!identifier)
-            return makeError(log_, here, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes, "Invalid Identifier: %s",
-                             "(null)");
+            return Reporter(log_, here.function)
+                .error(ErrorCode::cacheInputInvalid, "Invalid Identifier: %s", "(null)");
         const Key key{userId, containerClass, transient};
         {
             const MutexLock held(cacheLock_);

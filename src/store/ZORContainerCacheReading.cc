@@ -205,9 +205,9 @@ auto ZORContainerCache::readUnlocked(const Key& key, Read&& read) {
 
 Result<ZORContainerCache::ClassCache*> ZORContainerCache::_getCacheForUserId(const Key& key, Wanted wanted) {
     if (!configuration_.users().mayOwn(key.containerClass, key.userId))
-        return makeError(log_, ZOR_HERE, ErrorCode::cacheInputInvalid, nullptr, LogFlag::yes,
-                         "Invalid cache get-userId %u for class %ld", key.userId,
-                         static_cast<long>(key.containerClass));
+        return Reporter(log_, __func__)
+            .error(ErrorCode::cacheInputInvalid, "Invalid cache get-userId %u for class %ld", key.userId,
+                   static_cast<long>(key.containerClass));
     for (int reads = 0; reads < readsMax;) {
         ClassCache* const before = knownCache(key);
         if (before && (wanted == Wanted::asKnown || !before->hidesSome))

@@ -88,9 +88,9 @@ std::optional<FileURL> ZOREntitlementMapping::lostFile() {
 }
 
 ZORError ZOREntitlementMapping::notWritten(const ZORError& cause) const {
-    return makeError(log_, {"_writeEntitlementMappingToDisk", __LINE__}, ErrorCode::entitlementFileNotWritten, &cause,
-                     LogFlag::yes, "Failed to write entitlement mapping file at %s",
-                     entitlementMappingFileUrl_.c_str());
+    return Reporter(log_, "_writeEntitlementMappingToDisk")
+        .error(ErrorCode::entitlementFileNotWritten, &cause, "Failed to write entitlement mapping file at %s",
+               entitlementMappingFileUrl_.c_str());
 }
 
 Result<void> ZOREntitlementMapping::_writeEntitlementMappingToDisk(const plist::Dictionary& map) {
@@ -135,10 +135,11 @@ std::optional<plist::Value> ZOREntitlementMapping::_onQueue_store(const std::str
 Result<std::optional<ZOREntitlementMapping::Change>>
 ZOREntitlementMapping::_onQueue_apply(const std::vector<plist::Dictionary>& values,
                                       const std::vector<std::string>& keys, const std::vector<std::string>& whose) {
+    const Reporter report(log_, setFunction);
     if (values.size() != keys.size())
-        return makeError(log_, {setFunction, __LINE__}, ErrorCode::entitlementCountsDiffer, nullptr, LogFlag::yes,
-                         "Can't act on an invalid input: values count: %ld, IDs count: %ld",
-                         static_cast<long>(values.size()), static_cast<long>(keys.size()));
+        return report.error(ErrorCode::entitlementCountsDiffer,
+                            "Can't act on an invalid input: values count: %ld, IDs count: %ld",
+                            static_cast<long>(values.size()), static_cast<long>(keys.size()));
     generation_.fetch_add(1, std::memory_order_acq_rel);
     std::vector<std::pair<std::string, std::optional<plist::Value>>> previous;
     const Change owed = owed_;
@@ -156,8 +157,8 @@ ZOREntitlementMapping::_onQueue_apply(const std::vector<plist::Dictionary>& valu
             _onQueue_store(keys[i], hasValue ? std::optional<plist::Value>(values[i]) : std::nullopt);
         if (log_.writes(logLevelDebug)) {
             const plist::Value shown(values[i]);
-            log_.write(logLevelDebug, setFunction, "Staging Entitlement Mapping for ID: %s : %s", ZOR_SHOWN(keys[i]),
-                       plist::describe(hasValue ? &shown : nullptr).c_str());
+            report.write(logLevelDebug, "Staging Entitlement Mapping for ID: %s : %s", ZOR_SHOWN(keys[i]),
+                         plist::describe(hasValue ? &shown : nullptr).c_str());
         }
     }
     if (previous.empty()) {

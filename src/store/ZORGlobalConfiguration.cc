@@ -39,12 +39,13 @@ UserHome* ZORGlobalConfiguration::homeOf(std::uint32_t userId) const {
     return users_.isMobile(userId) ? homes_[userId - users_.first].get() : nullptr;
 }
 
-void ZORGlobalConfiguration::makeDirectory(const FileURL& url, const DirectoryAttributes& attributes,
-                                           const char* function, const char* what, Intermediates intermediates) {
+FileURL ZORGlobalConfiguration::madeDirectory(FileURL url, const DirectoryAttributes& attributes, const char* function,
+                                              const char* what, Intermediates intermediates) {
     const auto made = fileManager_.createDirectoryAtURL(url, intermediates, attributes);
     if (!made)
         log_.write(logLevelError, function, "Failed to create %s at \"%s\": %s", what, url.c_str(),
                    made.error().text().c_str());
+    return url;
 }
 
 ZORPerUserConfiguration* ZORGlobalConfiguration::getPerUserConfigurationForUserId(std::uint32_t userId) {
@@ -75,36 +76,27 @@ bool ZORGlobalConfiguration::homeAnswers(std::uint32_t userId, fs::MountFence::A
 
 FileURL ZORGlobalConfiguration::sharedContainersDirectory() {
     const RecursiveMutexLock held(lock_);
-    makeDirectory(places_.sharedContainersDirectory(), plainDirectory, __func__, "shared container dir");
-    return places_.sharedContainersDirectory();
+    return madeDirectory(places_.sharedContainersDirectory(), plainDirectory, __func__, "shared container dir");
 }
 
 FileURL ZORGlobalConfiguration::logDirectory() {
-    FileURL url = places_.logDirectory();
-    makeDirectory(url, ownDirectory, __func__, "log directory");
-    return url;
+    return madeDirectory(places_.logDirectory(), ownDirectory, __func__, "log directory");
 }
 
 FileURL ZORGlobalConfiguration::cachesDirectory() {
     const RecursiveMutexLock held(lock_);
-    FileURL url = places_.cachesDirectory();
-    makeDirectory(url, ownDirectory, __func__, "cache dir");
-    return url;
+    return madeDirectory(places_.cachesDirectory(), ownDirectory, __func__, "cache dir");
 }
 
 FileURL ZORGlobalConfiguration::libraryDirectory() {
     const RecursiveMutexLock held(lock_);
-    FileURL url = places_.libraryDirectory();
-    makeDirectory(url, ownDirectory, __func__, "library dir");
-    return url;
+    return madeDirectory(places_.libraryDirectory(), ownDirectory, __func__, "library dir");
 }
 
 FileURL ZORGlobalConfiguration::transientDirectory() {
     const RecursiveMutexLock held(lock_);
     cachesDirectory();
-    FileURL url = places_.transientDirectory();
-    makeDirectory(url, plainDirectory, __func__, "transient dir");
-    return url;
+    return madeDirectory(places_.transientDirectory(), plainDirectory, __func__, "transient dir");
 }
 
 FileURL ZORGlobalConfiguration::stagingDirectory() {
@@ -128,26 +120,21 @@ UsableDirectory ZORGlobalConfiguration::openStagingDirectory() {
 FileURL ZORGlobalConfiguration::deathrowDirectory() {
     const RecursiveMutexLock held(lock_);
     cachesDirectory();
-    FileURL url = places_.deathrowDirectory();
-    makeDirectory(url, plainDirectory, __func__, "deathrow dir");
-    return url;
+    return madeDirectory(places_.deathrowDirectory(), plainDirectory, __func__, "deathrow dir");
 }
 
 FileURL ZORGlobalConfiguration::replaceDirectory() {
     const RecursiveMutexLock held(lock_);
     libraryDirectory();
-    FileURL url = places_.replaceDirectory();
-    makeDirectory(url, plainDirectory, __func__, "replace dir");
-    return url;
+    return madeDirectory(places_.replaceDirectory(), plainDirectory, __func__, "replace dir");
 }
 
 FileURL ZORGlobalConfiguration::bundleDirectory() {
     const RecursiveMutexLock held(lock_);
     sharedContainersDirectory();
-    FileURL url = places_.bundleDirectory();
     // The migration of an older system's bundles gives the installer the whole place.
-    makeDirectory(url, {.mode = 0755, .otherOwner = users_.installer}, __func__, "bundle dir");
-    return url;
+    return madeDirectory(places_.bundleDirectory(), {.mode = 0755, .otherOwner = users_.installer}, __func__,
+                         "bundle dir");
 }
 
 FileURL ZORGlobalConfiguration::transientBundleDirectory() {
@@ -155,8 +142,8 @@ FileURL ZORGlobalConfiguration::transientBundleDirectory() {
     // One level at a time, never the home itself: the home of another service is not this daemon's to make.
     FileURL url = places_.brevadHomeDirectory();
     for (const std::string_view level : names::cachesLevels) {
-        url = url.appendingDirectory(level);
-        makeDirectory(url, ownedBy(users_.installer), __func__, "transient bundle dir", Intermediates::no);
+        url = madeDirectory(url.appendingDirectory(level), ownedBy(users_.installer), __func__, "transient bundle dir",
+                            Intermediates::no);
     }
     return url;
 }

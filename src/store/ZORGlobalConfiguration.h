@@ -95,8 +95,9 @@ public:
     [[nodiscard]] static const std::array<std::string_view, 4>& appUserDataItemNames();
 
 private:
-    void makeDirectory(const FileURL& url, const DirectoryAttributes& attributes, const char* function,
-                       const char* what, Intermediates intermediates = Intermediates::yes);
+    /// The directory, made where it is missing; a failure is logged.
+    FileURL madeDirectory(FileURL url, const DirectoryAttributes& attributes, const char* function, const char* what,
+                          Intermediates intermediates = Intermediates::yes);
 
     const Log& log_;
     ZORFileManager& fileManager_;

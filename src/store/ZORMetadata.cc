@@ -114,8 +114,9 @@ Result<void> ZORMetadata::writeMetadataToDiskWithError(const Log& log, ZORFileMa
     const auto written = writeToURL(fileContent(), container.appendingFile(names::metadataFile),
                                     writeAtomically | writeWithoutProtection, fs::metadataFileBytesMax, fileManager);
     if (!written)
-        return makeError(log, ZOR_HERE, ErrorCode::propertyListNotWritten, &written.error(), LogFlag::yes,
-                         "Failed to write metadata dictionary to URL %s", container.c_str());
+        return Reporter(log, __func__)
+            .error(ErrorCode::propertyListNotWritten, &written.error(), "Failed to write metadata dictionary to URL %s",
+                   container.c_str());
     return {};
 }
 

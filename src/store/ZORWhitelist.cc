@@ -34,14 +34,13 @@ ZORWhitelist::Mapping builtInSystemGroups() {
 }
 
 ZORWhitelist::Table tableIn(const plist::Dictionary& file, std::string_view key, const Log& log) {
-    constexpr const char* function = "ZORWhitelist";
+    const Reporter report(log, "ZORWhitelist");
     ZORWhitelist::Table table;
     const plist::Value* value = file.find(key);
     const plist::Dictionary* rows = value ? value->asDictionary() : nullptr;
     if (value && !rows) {
         const std::string shown(key);
-        log.write(logLevelError, function, "Well-known containers under %s are no dictionary; ignoring them",
-                  shown.c_str());
+        report.write(logLevelError, "Well-known containers under %s are no dictionary; ignoring them", shown.c_str());
         table.isWhole = false;
     }
     for (const auto& [identifier, row] : rows ? *rows : plist::Dictionary()) {
@@ -52,9 +51,8 @@ ZORWhitelist::Table tableIn(const plist::Dictionary& file, std::string_view key,
             table.rows.emplace(identifier, *name);
             continue;
         }
-        log.write(logLevelError, function,
-                  "Well-known container %s has no usable directory name of its own (%s); ignoring it",
-                  ZOR_SHOWN(identifier), plist::describe(&row).c_str());
+        report.write(logLevelError, "Well-known container %s has no usable directory name of its own (%s); ignoring it",
+                     ZOR_SHOWN(identifier), plist::describe(&row).c_str());
         table.isWhole = false;
     }
     return table;

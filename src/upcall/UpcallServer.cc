@@ -74,6 +74,7 @@ ReturnCode readStringItem(const Log& log, sb_packbuff& packbuff, std::uint16_t v
 }
 
 ReturnCode readItem(const Log& log, sb_packbuff& packbuff, std::uint16_t valueType, ProcessContainersRequest& request) {
+    const Reporter report(log, function);
     switch (valueType) {
     case CM_KERN_REQUEST_CODE_SIGNATURE_ID:
     case CM_KERN_REQUEST_CONTAINER_ID:
@@ -87,14 +88,14 @@ ReturnCode readItem(const Log& log, sb_packbuff& packbuff, std::uint16_t valueTy
         request.personaId = sb_packbuff_unpack_uint32(&packbuff, &error);
         if (error == packbuffSuccess)
             return ReturnCode::success;
-        log.write(logLevelError, function, "failed: to unpack uint32 for CM_KERN_REQUEST_PERSONA_ID. error: %d", error);
+        report.write(logLevelError, "failed: to unpack uint32 for CM_KERN_REQUEST_PERSONA_ID. error: %d", error);
         return ReturnCode::refused;
     }
     case CM_KERN_REQUEST_CONTAINER_TYPE:
-        log.write(logLevelError, function, "CM_KERN_REQUEST_CONTAINER_TYPE is not currently supported!");
+        report.write(logLevelError, "CM_KERN_REQUEST_CONTAINER_TYPE is not currently supported!");
         return ReturnCode::unsupportedItem;
     default:
-        log.write(logLevelError, function, "unexpected value: %u", valueType);
+        report.write(logLevelError, "unexpected value: %u", valueType);
         return ReturnCode::unsupportedItem;
     }
 }
@@ -119,7 +120,7 @@ namespace {
 class ReplyPacker {
 public:
     ReplyPacker(const Log& log, sb_packbuff& packbuff, bool success)
-        : log_(log), packbuff_(packbuff), success_(success) {}
+        : report_(log, function), packbuff_(packbuff), success_(success) {}
 
     void path(std::uint16_t valueType, const std::optional<std::string>& path) {
         if (!success_ || !path)
@@ -129,8 +130,8 @@ public:
         if (error == packbuffSuccess)
             return;
         success_ = false;
-        log_.write(logLevelError, function, "sb_packbuff_pack_string() fails: %d; type: %u, path: %s", error, valueType,
-                   path->c_str());
+        report_.write(logLevelError, "sb_packbuff_pack_string() fails: %d; type: %u, path: %s", error, valueType,
+                      path->c_str());
     }
 
     /// `what` is what the line about a failure calls such a container.
@@ -144,9 +145,8 @@ public:
             if (error == packbuffSuccess)
                 continue;
             success_ = false;
-            log_.write(logLevelError, function,
-                       "sb_packbuff_pack_key_with_string_value() fails: %d; group ID: %s, %s: %s", error,
-                       ZOR_SHOWN(identifier), what, container.c_str());
+            report_.write(logLevelError, "sb_packbuff_pack_key_with_string_value() fails: %d; group ID: %s, %s: %s",
+                          error, ZOR_SHOWN(identifier), what, container.c_str());
             return;
         }
     }
@@ -155,12 +155,12 @@ public:
         const std::uint32_t value = success_ ? 1 : 0;
         const int error = sb_packbuff_pack_uint32(&packbuff_, CM_KERN_REPLY_STATUS, value);
         if (error != packbuffSuccess)
-            log_.write(logLevelError, function, "sb_packbuff_pack_uint32() fails: %d; type: %u, value: %u", error,
-                       CM_KERN_REPLY_STATUS, value);
+            report_.write(logLevelError, "sb_packbuff_pack_uint32() fails: %d; type: %u, value: %u", error,
+                          CM_KERN_REPLY_STATUS, value);
     }
 
 private:
-    const Log& log_;
+    const Reporter report_;
     sb_packbuff& packbuff_;
     bool success_;
 };
@@ -304,18 +304,19 @@ ReturnCode UpcallServer::server_get_process_containers(upcall::Bytes request, pi
 }
 
 ReturnCode UpcallServer::readRequest(upcall::Bytes bytes, ProcessContainersRequest& request) const {
+    const Reporter report(log_, function);
     std::vector<std::uint8_t> buffer(bytes.begin(), bytes.end());
     if (log_.writes(logLevelDebug))
-        log_.write(logLevelDebug, function, "request size: %u (%p)", static_cast<unsigned>(buffer.size()),
-                   static_cast<const void*>(buffer.data()));
+        report.write(logLevelDebug, "request size: %u (%p)", static_cast<unsigned>(buffer.size()),
+                     static_cast<const void*>(buffer.data()));
     const PackbuffPointer reader(sb_packbuff_init_with_buffer(buffer.data(), buffer.size(), true, packbuffDeallocNone));
     if (!reader) {
-        log_.write(logLevelError, function, "sb_packbuff_init() of request data fails");
+        report.write(logLevelError, "sb_packbuff_init() of request data fails");
         return ReturnCode::noBuffer;
     }
     if (log_.writes(logLevelDebug))
-        log_.write(logLevelDebug, function, "request packbuff byte address:%p",
-                   static_cast<const void*>(sb_packbuff_get_bytes(reader.get())));
+        report.write(logLevelDebug, "request packbuff byte address:%p",
+                     static_cast<const void*>(sb_packbuff_get_bytes(reader.get())));
     return readProcessContainersRequest(log_, *reader, request);
 }
 
@@ -350,11 +351,10 @@ std::optional<std::string> UpcallServer::homeDirectoryOf(std::uint32_t personaId
 }
 
 void UpcallServer::logContainers(const ProcessContainersRequest& request, const ProcessContainers& containers) const {
-    const auto line = [&](const char* name, const char* value) {
-        log_.write(logLevelDebug, function, "%s: %s", name, value);
-    };
-    log_.write(logLevelDebug, function, "UPCALL-Containers for %s(%u):", ZOR_SHOWN(request.dataContainerIdentifier()),
-               request.personaId);
+    const Reporter report(log_, function);
+    const auto line = [&](const char* name, const char* value) { report.write(logLevelDebug, "%s: %s", name, value); };
+    report.write(logLevelDebug, "UPCALL-Containers for %s(%u):", ZOR_SHOWN(request.dataContainerIdentifier()),
+                 request.personaId);
     line("dataContainerURL", orNull(containers.dataContainer));
     line("tempContainerURL", orNull(containers.temporaryDirectory));
     line("homeDirURL", orNull(containers.homeDirectory));
@@ -364,6 +364,7 @@ void UpcallServer::logContainers(const ProcessContainersRequest& request, const 
 }
 
 void UpcallServer::copyReply(const sb_packbuff& packbuff, std::vector<std::uint8_t>& reply) const {
+    const Reporter report(log_, function);
     const std::uint8_t* const bytes = sb_packbuff_get_bytes(&packbuff);
     const std::size_t size = sb_packbuff_get_size(&packbuff);
     int error = upcall::ReplyOffset::buffer + size > port_.replyBytesMax() ? EMSGSIZE : 0;
@@ -375,12 +376,11 @@ void UpcallServer::copyReply(const sb_packbuff& packbuff, std::vector<std::uint8
         }
     }
     if (error != 0)
-        log_.write(logLevelError, function, "copyReply(%p, %lu) fails: %d", static_cast<const void*>(bytes), size,
-                   error);
+        report.write(logLevelError, "copyReply(%p, %lu) fails: %d", static_cast<const void*>(bytes), size, error);
     else if (log_.writes(logLevelDebug))
-        log_.write(logLevelDebug, function, "packbuff bytes: %p, reply bytes: %p, reply size: %u",
-                   static_cast<const void*>(bytes), static_cast<const void*>(reply.data()),
-                   static_cast<unsigned>(size));
+        report.write(logLevelDebug, "packbuff bytes: %p, reply bytes: %p, reply size: %u",
+                     static_cast<const void*>(bytes), static_cast<const void*>(reply.data()),
+                     static_cast<unsigned>(size));
 }
 
 } // namespace zor

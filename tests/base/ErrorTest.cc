@@ -23,9 +23,10 @@ TEST(Error, IsLoggedOnceWhereItIsMade) {
     const ZORError cause = posixError({"rename", 7}, Errno(ENOENT), "rename of %s failed", "/a");
     support::RecordingLog sink(logLevelNotice);
     const Log log(sink);
-    for (const LogFlag flag : {LogFlag::no, LogFlag::yes})
-        EXPECT_TRUE(makeError(log, {"operation", 42}, ErrorCode::moveToLiveFailed, &cause, flag, "moving %d", 5)
-                        .is(ErrorCode::moveToLiveFailed));
+    const Reporter report(log, "operation");
+    const CodeOfLine failed{ErrorCode::moveToLiveFailed, 42};
+    EXPECT_TRUE(report.unlogged(failed, "moving %d", 5).is(ErrorCode::moveToLiveFailed));
+    EXPECT_TRUE(report.error(failed, &cause, "moving %d", 5).is(ErrorCode::moveToLiveFailed));
     EXPECT_EQ(sink.take(), (std::vector<LogLine>{{3, "operation", "42: moving 5 (POSIX 2 \"rename of /a failed\")"}}));
     for (const auto& [number, code] : {std::pair(EPERM, EACCES), {EAGAIN, 1000 + EAGAIN}, {ENOTEMPTY, ENOTEMPTY}})
         EXPECT_EQ(posixError(ZOR_HERE, Errno(number), "x").replyCode(),

@@ -198,7 +198,7 @@ TEST(Journal, TellsErrorsFromWhatClientsDoWrong) {
         if (isClients)
             asked.emplace(request);
         if (code)
-            (void)makeError(log, {"f", 7}, *code, nullptr, LogFlag::yes, "two\nlines");
+            Reporter(log, "f").error({*code, 7}, "two\nlines");
         else
             log.write(3, "f", "two\nlines");
         char entry[1024];

@@ -31,9 +31,10 @@ namespace zor::commands {
     const auto& own = context.client->clientBundleIdentifier();
     if (!context.client->onlyOwnIdentifier() || !identifier || (own && *identifier == *own))
         return true;
-    makeError(context.log, ZOR_HERE, ErrorCode::notEntitled, nullptr, LogFlag::yes,
-              "%s may ask for its own identifier only, not for %s (\"OnlyOwnIdentifier\" in its registry entry)",
-              ZOR_SHOWN(own), ZOR_SHOWN(*identifier));
+    Reporter(context.log, __func__)
+        .error(ErrorCode::notEntitled,
+               "%s may ask for its own identifier only, not for %s (\"OnlyOwnIdentifier\" in its registry entry)",
+               ZOR_SHOWN(own), ZOR_SHOWN(*identifier));
     context.error = ErrorCode::notEntitled;
     return false;
 }

@@ -20,10 +20,11 @@ constexpr std::size_t replyEntries = 5;
 bool mayAskForTransient(CommandContext& context, const std::string* identifier, ContainerClass containerClass) {
     if (isPerUserClass(containerClass) || context.client->allowOtherIdLookup())
         return true;
-    makeError(context.log, ZOR_HERE, ErrorCode::notEntitled, nullptr, LogFlag::yes,
-              "%s may not ask for the transient container of %s in class %ld: it is the installer's or the system's",
-              ZOR_SHOWN(context.client->clientBundleIdentifier()), ZOR_SHOWN(identifier),
-              static_cast<long>(containerClass));
+    Reporter(context.log, __func__)
+        .error(ErrorCode::notEntitled,
+               "%s may not ask for the transient container of %s in class %ld: it is the installer's or the system's",
+               ZOR_SHOWN(context.client->clientBundleIdentifier()), ZOR_SHOWN(identifier),
+               static_cast<long>(containerClass));
     context.error = ErrorCode::notEntitled;
     return false;
 }

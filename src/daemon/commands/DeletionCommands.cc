@@ -24,9 +24,10 @@ bool listsAreUsable(CommandContext& context, const plist::Array& classes, const 
     const auto isUuid = [](const plist::Value& element) { return UUID::of(&element).has_value(); };
     if (users <= classes.size() && std::ranges::all_of(classes, isUnsigned) && std::ranges::all_of(uuids, isUuid))
         return true;
-    makeError(context.log, {"stageContainerForDelete", __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-              "Can't act on an invalid input: user count: %ld, class count: %ld, or an element of another type",
-              static_cast<long>(users), static_cast<long>(classes.size()));
+    Reporter(context.log, "stageContainerForDelete")
+        .error(ErrorCode::invalidObject,
+               "Can't act on an invalid input: user count: %ld, class count: %ld, or an element of another type",
+               static_cast<long>(users), static_cast<long>(classes.size()));
     context.error = ErrorCode::invalidObject;
     return false;
 }

@@ -59,8 +59,9 @@ bool isDictionaryOrAbsent(CommandContext& context, std::string_view key) {
     if (!value || value->asDictionary())
         return true;
     // Taken for absent it would remove what is stored.
-    makeError(context.log, {"processEntitlements", __LINE__}, ErrorCode::invalidObject, nullptr, LogFlag::yes,
-              "Can't act on an invalid object: %s: %s", std::string(key).c_str(), plist::describe(value).c_str());
+    Reporter(context.log, "processEntitlements")
+        .error(ErrorCode::invalidObject, "Can't act on an invalid object: %s: %s", std::string(key).c_str(),
+               plist::describe(value).c_str());
     context.error = ErrorCode::invalidObject;
     return false;
 }
@@ -106,7 +107,7 @@ void getSystemGroupContainerPaths(CommandContext& context) {
 }
 
 void getSystemGroupContainerPath(CommandContext& context) {
-    constexpr const char* function = "systemGroupContainerPath";
+    const Reporter report(context.log, "systemGroupContainerPath");
     const std::string* group = context.request.string(keys::groupIdentifier);
     std::optional<std::string> path;
     if (group && isEntitledTo(context, *group)) {
@@ -114,8 +115,8 @@ void getSystemGroupContainerPath(CommandContext& context) {
     } else if (group && context.operations.whitelist.systemGroupContainerIdIsWellknown(*group)) {
         path = wellKnownGroupPath(context, *group);
     } else {
-        context.log.write(logLevelError, function, "%s is not entitled for system group identifier: %s",
-                          ZOR_SHOWN(context.client->clientBundleIdentifier()), ZOR_SHOWN(group));
+        report.write(logLevelError, "%s is not entitled for system group identifier: %s",
+                     ZOR_SHOWN(context.client->clientBundleIdentifier()), ZOR_SHOWN(group));
         context.error = ErrorCode::notEntitled;
         return;
     }
@@ -123,8 +124,8 @@ void getSystemGroupContainerPath(CommandContext& context) {
         context.reply.set(keys::replyPath, std::move(*path));
         return;
     }
-    context.log.write(logLevelError, function, "Did not find system group container with identifier: %s for %s",
-                      ZOR_SHOWN(*group), ZOR_SHOWN(ownIdentifierByDefault(context)));
+    report.write(logLevelError, "Did not find system group container with identifier: %s for %s", ZOR_SHOWN(*group),
+                 ZOR_SHOWN(ownIdentifierByDefault(context)));
     context.error = ErrorCode::notFound;
 }
 
