@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Calls of the C interface that do not wait: a thread carries them out, one after the other.
 //
-// A call is a node that goes from list to list: waiting, under way, answered. Whatever a node needs is taken when the
+// A call is a node that goes from list to list: waiting, under way, answered. All that a node needs is taken when the
 // call is started, so that a call that was started is answered also where there is no memory left. The thread alone
 // touches the session, and the answer of the call that is under way; all else is under the mutex, which is never held
 // while somebody waits or a callback runs.

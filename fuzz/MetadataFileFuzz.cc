@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// Any bytes as a container's metadata file. Whatever is accepted holds what the daemon relies on, and a file written
+// Any bytes as a container's metadata file. A file that is accepted holds what the daemon relies on, and a file written
 // from the record reads back as the same record. The first byte chooses the user and whether the class path is checked.
 #include "plist/Codec.h"
 #include "store/ZORMetadata.h"

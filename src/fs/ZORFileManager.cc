@@ -146,7 +146,7 @@ Result<void> ZORFileManager::mendDirectory(int directory, const FileURL& url, co
     const mode_t mode = status.st_mode & permissionBits;
     if (groupFits && mode == attributes.mode)
         return {};
-    // Whatever user can write the parent can have given its name to another directory of this owner's, one that is
+    // Any user who can write the parent can have given its name to another directory of this owner's, one that is
     // closed for a reason. Only who may write the directory itself can move it to another parent meanwhile.
     if (::fstatat(directory, "..", &parent, 0) != 0)
         return posixError(ZOR_HERE, Errno::last(), "opendir of %s failed: %s", url.c_str(), Errno::last().text());

@@ -170,7 +170,7 @@ ZORError ZORDataProtectionChangeOperation::changedMeanwhile() {
 Result<void> ZORDataProtectionChangeOperation::checkStillThere(const IdentifierLock& held) {
     ZOR_ASSERT(held.identifier() == dataContainerMetadata_->uuid().string());
     const ZORMetadata& container = *dataContainerMetadata_;
-    // Whatever else the identifier leads to, its record may be in another's hands: it is looked for, and not looked at.
+    // A record that the identifier leads to may be in another's hands: it is looked for, and not looked at.
     const auto found =
         needs_.cache.containerForUser(container.uid(), container.containerClass(), &container.identifier(), false);
     if (!found)

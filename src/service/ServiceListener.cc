@@ -55,7 +55,7 @@ private:
     void arm() { [[maybe_unused]] const bool armed = core_.pool.change(socket_, *this, EPOLLIN | EPOLLET); }
 
     void admit(PeerSocket socket) {
-        // A peer that connected before the listening socket came to the daemon has not taken it over. Whatever such a
+        // A peer that connected before the listening socket came to the daemon has not taken it over. All that such a
         // one has sent would come with descriptors in the place of credentials.
         if (const Errno error = enableSenderCredentials(socket.get()))
             return core_.incidents.happened(ListenerIncident::unknownPeer, error.number());

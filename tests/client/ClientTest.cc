@@ -78,7 +78,7 @@ plist::Dictionary with(plist::Dictionary dictionary, std::string_view key, plist
     return dictionary;
 }
 
-// Whatever a daemon sends, or does not send, a call ends with the right kind of error and no crash.
+// A call ends with the right kind of error and no crash, whatever a daemon sends or does not send.
 TEST(Client, EveryAnswerHasItsKind) {
     struct Row {
         const char* what;

@@ -52,7 +52,7 @@ TEST(PeerIdentity, EndsWithTheProgramAndTheProcess) {
     EXPECT_EQ(unknown->identify(Peer::Explain::yes).explanation, "no entry names " + world.program("other"));
 }
 
-// Whoever connects and is gone before its peer is asked for is nobody, and its pid is not looked up again.
+// A peer that connects and is gone before it is asked for is nobody, and its pid is not looked up again.
 TEST(PeerIdentity, IsNobodyWhoWasGoneBeforeTheAccept) {
     PeerWorld world;
     world.registerAs("a.plist", "agent", "agent");

@@ -8,7 +8,7 @@ plist::Dictionary withData(std::size_t bytes) {
     return {{"Payload", plist::Data(bytes, 0x5A)}};
 }
 
-// Whatever is no request ends its connection with one "other" and one "invalid" event, without a reply, and marks
+// A frame that is no request ends its connection with one "other" and one "invalid" event, without a reply, and marks
 // nobody else: broken frames, each alone and behind a good request.
 TEST(ListenerFrame, BrokenFramesEndTheirConnectionOnly) {
     const auto framed = [](std::uint32_t flags, const plist::Data& payload) {

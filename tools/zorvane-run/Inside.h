@@ -5,7 +5,7 @@
 // It is executed through a descriptor, since it lies nowhere in the sandbox. Descriptors for its own use (the
 // sandbox's lead outside) are closed by the execution; sockets that were passed stay. The caller's keys, umask and
 // ignored signals end here; its priority, limits and the like go on to the program: a service manager sets them for it.
-// Whatever of this does not work out ends it: the program never runs with more than its user may.
+// A part of this that does not work out ends it: the program never runs with more than its user may.
 #pragma once
 
 #include <string>

@@ -57,7 +57,7 @@ zor::ErrnoOr<FileDescriptor> openPlain(const Root& root, const std::string& path
     return openBeneath(root.descriptor.get(), path.substr(beginBelow(root)).c_str(), O_PATH | O_DIRECTORY);
 }
 
-/// A container below the home's fence, if there is one. Whoever owns a directory there can mount a file system that
+/// A container below the home's fence, if there is one. The owner of a directory there can mount a file system that
 /// never answers: none is entered.
 zor::ErrnoOr<FileDescriptor> openContainer(const Root& root, const std::string& path, zor::fs::MountFence* home) {
     auto opened = home ? home->open(path.c_str() + beginBelow(root), O_PATH | O_DIRECTORY) : openPlain(root, path);

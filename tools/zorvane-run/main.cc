@@ -54,8 +54,8 @@ Result<Prepared> prepare(const Root& root, const Options& options) {
     return Prepared{.told = std::move(told), .mounts = std::move(mounts)};
 }
 
-/// Looks for an assertion before anything is made, and again when all is: that may have taken minutes. Whoever waited
-/// then prepares anew, for the containers may be others by now.
+/// Looks for an assertion before anything is made, and again when all is: that may have taken minutes. A launch that
+/// waited then prepares anew, for the containers may be others by now.
 Result<int> start(const Options& options) {
     Notifications notifications = TRY(Notifications::ofCaller());
     if (const char* const failed = leaveMountNamespace())

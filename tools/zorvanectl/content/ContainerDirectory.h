@@ -18,7 +18,7 @@ using zor::fs::MountFence;
 /// not answer, this ends after homePatience.
 [[nodiscard]] Outcome<zor::platform::FileDescriptor> openToldContainer(const std::string& path, MountFence::Kind kind);
 
-/// The same of a container that is to be filled. Whoever owns a directory above it can put another one in its place
+/// The same of a container that is to be filled. The owner of a directory above it can put another one in its place
 /// meanwhile, and what is written here is written by root: so it has to hold the daemon's record, which no other user
 /// can make.
 [[nodiscard]] Outcome<zor::platform::FileDescriptor> openNewContainer(zor::platform::Disk& disk,

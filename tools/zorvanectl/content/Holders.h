@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Whether root may read, for whoever gets the content, what lies in somebody's directory.
 //
-// Whoever owns a directory can move into it, or link there, what belongs to others and is closed to him; an
+// The owner of a directory can move into it, or link there, what belongs to others and is closed to him; an
 // installation reads as root and gives what it read away. So each item is judged against all the owners of directories
 // on the way to it: it has to belong to them, or be readable for everybody. Root and whoever runs the program are no
 // such owners. Anybody may have put an item where everybody may write; into a sticky directory nobody moves what is
