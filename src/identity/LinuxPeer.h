@@ -9,7 +9,7 @@
 // executed another file since it was accepted is granted nothing, and never again: what it sends now may have been
 // begun by the program of before. The same file executed again changes nothing, unless it has a set-ID bit and gives a
 // user or group that the process did not connect with; that is looked at for such files alone, and there it tells also
-// of a program that was executed between the connect and the accept. Whatever cannot be examined (the process has
+// of a program that was executed between the connect and the accept. A process that cannot be examined (it has
 // ended, or belongs to somebody whom a daemon that is not root may not look at) is granted nothing.
 //
 // Not told apart: a program without set-ID bits that is executed before the accept, and one that executes another,

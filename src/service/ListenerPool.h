@@ -11,8 +11,8 @@
 //   not
 //     parked yet;
 //   - whenever fewer are active than may run, at least one is waiting, or the pool has threadsMax threads: so work that
-//     arrives is always seen by somebody. Whoever makes "nobody waits" or "fewer are active" true looks at the other
-//     and adds a worker; both counters are sequentially consistent, so one of two that meet sees it;
+//     arrives is always seen by somebody. A thread that makes "nobody waits" or "fewer are active" true looks at the
+//     other and adds a worker; both counters are sequentially consistent, so one of two that meet sees it;
 //   - an event wakes one worker, and whoever leaves tasks waiting for their turn (ListenerShares.h) wakes one that has
 //     nothing to do. A task may be called for an event that is out of date, or while another worker has it: it has to
 //     tell that itself.

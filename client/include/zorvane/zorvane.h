@@ -314,7 +314,7 @@ const char* zorvane_result_next_page(const zorvane_result* result);
 //
 // An async object has one thread of its own, in which signals are blocked and no code of the caller's runs. It connects
 // when the first call is started, and carries calls out one after the other, in the order in which they were started:
-// two that are to be under way at once need two objects. Whoever started it watches zorvane_async_fd and calls
+// two that are to be under way at once need two objects. Its owner watches zorvane_async_fd and calls
 // zorvane_async_dispatch when it is readable.
 
 // Called by zorvane_async_dispatch, in its thread. One of result, which is then the callback's to free, and error,

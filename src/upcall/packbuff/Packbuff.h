@@ -3,8 +3,8 @@
 // docs/formats.md; programs outside the daemon speak it too, so this library knows nothing of the daemon.
 //
 // Invariants of a handle: bytes_used <= bytes_allocated, bytes_remaining is their difference, and the cursor of a
-// writer is at the end item, 8 bytes before bytes_used. Whatever the bytes of a buffer are, and however a handle's
-// size was set, nothing outside the buffer is read or written. Neither the buffer's address nor its size need be
+// writer is at the end item, 8 bytes before bytes_used. Nothing outside the buffer is read or written, whatever
+// its bytes are, and however a handle's size was set. Neither the buffer's address nor its size need be
 // aligned.
 //
 // Nothing here throws or logs. One handle is used by one thread at a time.
