@@ -124,7 +124,8 @@ void Log::writeText(int level, const char* function, std::string_view message) c
     }
 }
 
-Shown::Shown(const std::string& text) : text_(text.c_str()) {
+void Shown::show(const std::string& text) {
+    text_ = text.c_str();
     if (text.size() > shownBytesMax) {
         copy_ = text.substr(0, shownBytesMax);
         text_ = copy_.c_str();

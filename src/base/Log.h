@@ -112,17 +112,23 @@ private:
 /// must cut. Lives as long as the full expression it is written in.
 class Shown {
 public:
-    Shown(const char* text) : text_(text ? text : "(null)") {}
-    Shown(const std::string& text);
-    Shown(const std::string* text) : Shown(text ? Shown(*text) : Shown("(null)")) {}
+    Shown(const char* text) : text_(text ? text : absent) {}
+    Shown(const std::string& text) { show(text); }
+    Shown(const std::string* text) : text_(absent) {
+        if (text)
+            show(*text);
+    }
     Shown(const std::optional<std::string>& text) : Shown(text ? &*text : nullptr) {}
     Shown(const Shown& other) : copy_(other.copy_), text_(copy_.empty() ? other.text_ : copy_.c_str()) {}
     Shown& operator=(const Shown&) = delete;
     [[nodiscard]] const char* text() const { return text_; }
 
 private:
+    static constexpr const char* absent = "(null)";
+    void show(const std::string& text);
+
     std::string copy_;
-    const char* text_;
+    const char* text_ = absent;
 };
 #define ZOR_SHOWN(object) (::zor::Shown(object).text())
 

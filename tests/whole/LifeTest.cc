@@ -405,9 +405,9 @@ TEST(Tool, HelpPageCompletionAndSchemasAgree) {
     expectCall(daemon, {{"create", "org.plain", "--class", "2"}, 0, "created"});
     expectCall(daemon, {{"create", "$(touch x)", "--class", "2"}, 0, "created"});
     expectCall(daemon, {{"entitlements", "set", "a.b", "--app-group", "group.a"}, 0, "registered"});
-    using Words = std::vector<std::string>;
-    EXPECT_EQ(completed(daemon, {"lookup"}, ""), Words{"org.plain"});
-    EXPECT_EQ(completed(daemon, {"why", "-g"}, "gr"), Words{"group.a"});
+    using Completions = std::vector<std::string>;
+    EXPECT_EQ(completed(daemon, {"lookup"}, ""), Completions{"org.plain"});
+    EXPECT_EQ(completed(daemon, {"why", "-g"}, "gr"), Completions{"group.a"});
     const auto shell =
         runProgram({"/bin/bash", "-c",
                     "PATH=" + programPath("") + ":$PATH; . " + packagingPath("completions/zorvanectl.bash") +

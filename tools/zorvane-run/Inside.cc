@@ -113,10 +113,10 @@ int runInside(int argumentCount, char** arguments) {
     if (!become(user))
         return say(withReason("cannot become user " + std::to_string(user), zor::Errno::last()), exitFailure);
     // As the user: a container may be closed to everybody else.
-    const char* const directory = std::getenv("HOME");
-    if (!directory || ::chdir(directory) != 0 || ::setenv("PWD", directory, 1) != 0)
-        return say(withReason("cannot go to " + std::string(directory ? directory : "HOME"), zor::Errno::last()),
-                   exitFailure);
+    const char* const home = std::getenv("HOME");
+    const std::string directory = home ? home : "HOME";
+    if (!home || ::chdir(home) != 0 || ::setenv("PWD", directory.c_str(), 1) != 0)
+        return say(withReason("cannot go to " + directory, zor::Errno::last()), exitFailure);
     ::umask(usualUmask);
     takeSignals();
     const zor::platform::FileDescriptor self(static_cast<int>(::syscall(SYS_pidfd_open, ::getpid(), 0)));
