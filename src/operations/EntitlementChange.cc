@@ -99,15 +99,24 @@ ErrorCode EntitlementChange::settle(Change change) {
 
 Result<void> EntitlementChange::removeEntitlementDictionariesForIdentifierAndItsChildren(
     const std::string& identifier, std::optional<Change>& change, const AllIdentifiersWriteLock& lock) {
-    for (const std::string& one : withChildren(identifier)) {
+    const std::vector<std::string> all = withChildren(identifier);
+    // Of all of them before the first goes: with an identifier the map forgets whose children the others are.
+    for (const std::string& one : all)
+        TRY(refuseIfUnderWay(one, lock));
+    for (const std::string& one : all) {
         std::optional<Change> its;
-        auto processed = process(nullptr, one, nullptr, its, lock);
+        const auto processed = process(nullptr, one, nullptr, its, lock);
         change = std::max(change, its);
-        if (!processed && ReplaceRecovery::metOneUnderWay(processed.error()))
-            return processed;
         sayIfNotCleared(one, processed ? ErrorCode::success : processed.error().replyCode());
     }
     return {};
+}
+
+Result<void> EntitlementChange::refuseIfUnderWay(const std::string& identifier, const AllIdentifiersWriteLock& lock) {
+    if (needs_.entitlements.identifierHasSystemContainer(identifier))
+        TRY(needs_.removal.refuseIfUnderWay(needs_.configuration.users().system, ContainerClass::dataSystem,
+                                            identifier));
+    return needs_.groups.refuseIfUnderWay(identifier, lock);
 }
 
 void EntitlementChange::settleRemoval(const std::string& identifier, Change change) {

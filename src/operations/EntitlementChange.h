@@ -52,8 +52,8 @@ public:
     /// Reads what the removal will have to know of containers, before the lock is taken.
     void prepareRemoval(const std::string& identifier);
     /// Removes what is stored for an identifier and for the children recorded for it. `change` gets the last change
-    /// that is to be settled when the lock is released (settleRemoval), if it is later. Failures are logged; an error
-    /// only where ReplaceRecovery::metOneUnderWay: a part may have been done, and the rest is done when called again.
+    /// that is to be settled when the lock is released (settleRemoval). Failures are logged; an error only where
+    /// ReplaceRecovery::metOneUnderWay: nothing has been done then.
     Result<void> removeEntitlementDictionariesForIdentifierAndItsChildren(const std::string& identifier,
                                                                           std::optional<Change>& change,
                                                                           const AllIdentifiersWriteLock& lock);
@@ -66,6 +66,8 @@ private:
     /// Does the same as prepareRemoval, for a change of one identifier.
     void prepare(const std::string& identifier);
     std::vector<std::string> withChildren(const std::string& identifier) const;
+    /// Error metOneUnderWay while something that goes with the entitlements of `identifier` is being replaced.
+    [[nodiscard]] Result<void> refuseIfUnderWay(const std::string& identifier, const AllIdentifiersWriteLock& lock);
     void sayIfNotCleared(const std::string& identifier, ErrorCode code) const;
     /// `change` gets what is to be settled, if anything is. An error of ReplaceRecovery::metOneUnderWay comes before
     /// the map is changed; containers may have gone that the map still speaks of.

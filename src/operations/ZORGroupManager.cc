@@ -58,6 +58,21 @@ void ZORGroupManager::prepare(const std::string& identifier) {
             forEachUser(type, [&](std::uint32_t userId) { needs_.cache.prepare(userId, classOf(type), false); });
 }
 
+Result<void> ZORGroupManager::refuseIfUnderWay(const std::string& identifier, const AllIdentifiersWriteLock& /*held*/) {
+    const UserNumbers& users = needs_.configuration.users();
+    const auto refuse = [&](GroupType type, const Identifiers& groups, std::uint32_t first,
+                            std::uint32_t last) -> Result<void> {
+        for (const std::string& group : groups.value_or(std::vector<std::string>()))
+            for (std::uint32_t userId = first; userId <= last; ++userId)
+                TRY(needs_.recovery.refuseIfUnderWay(userId, classOf(type), group));
+        return {};
+    };
+    TRY(refuse(GroupType::application, needs_.entitlements.appGroupIdentifiersForIdentifier(identifier), users.first,
+               users.last));
+    return refuse(GroupType::system, needs_.entitlements.systemGroupIdentifiersForIdentifier(identifier), users.system,
+                  users.system);
+}
+
 Result<void> ZORGroupManager::handleChangeFromOldGroupContainerIds(Identifiers oldGroups, const Identifiers& newGroups,
                                                                    GroupType type, const std::string& identifier,
                                                                    std::vector<FileURL>& changed,

@@ -57,6 +57,9 @@ public:
 
     /// For who is about to change the entitlements of an identifier, without a lock: has read what the next needs.
     void prepare(const std::string& identifier);
+    /// Error metOneUnderWay while the container of a group of `identifier` is being replaced, whoever else refers to
+    /// it.
+    [[nodiscard]] Result<void> refuseIfUnderWay(const std::string& identifier, const AllIdentifiersWriteLock& lock);
     /// Stages the containers of groups that lose their last reference by a change of `identifier` that has not been
     /// applied: the map still holds what was before. `changed` as ContainerRemoval::stage has it. One that cannot be
     /// staged is logged and stays for the next boot; an error only where ReplaceRecovery::metOneUnderWay.

@@ -108,8 +108,9 @@ namespace {
 
 /// The socket, the directory of the process in /proc, and its address space.
 constexpr std::size_t descriptorsPerConnection = 3;
-/// Not for connections: a quarter, which is more than the threads that run at once take for their walks, and at least
-/// what an idle daemon and all upcall connections take, unless that is more than half.
+/// Not for connections: a quarter, which is more than the threads that run at once take for their walks (some thirty
+/// each; eighty for a change of class, which few may ask for), and at least what an idle daemon and all upcall
+/// connections take, unless that is more than half.
 constexpr std::size_t shareOfOwn = 4;
 constexpr std::size_t ownLeast = 256;
 

@@ -65,10 +65,12 @@ std::size_t ZORContainerCache::infoBytesOf(const ZORMetadata& record) {
 void ZORContainerCache::store(ClassCache& cache, Record record, std::size_t infoBytes) {
     ZOR_ASSERT(record);
     remove(cache, record->identifier());
-    if (infoBytes > 0)
-        cache.infoBytesOf[record.get()] = infoBytes;
-    cache.infoBytes += infoBytes;
+    const ZORMetadata* const stored = record.get();
     cache.records.insert(std::move(record));
+    if (infoBytes > 0) {
+        cache.infoBytesOf[stored] = infoBytes; // may want memory; then the size is not in the sum either
+        cache.infoBytes += infoBytes;
+    }
 }
 
 void ZORContainerCache::remove(ClassCache& cache, std::string_view identifier) {

@@ -420,12 +420,14 @@ TEST_F(ReplaceWithoutOrder, OnlyWhoHasToDoWithItWaits) {
              return codeOf(world.daemonsClient().regenerateDirectoryUUIDForUser(addressOf(fresh)));
          }},
         {[&](auto&, auto&) { return world.entitle("holder", std::nullopt); }},
-        {[&](auto&, auto& holder) { return world.stage(holder); }},
+        {[&](auto&, auto& holder) { return world.stage(holder); }}, // holder's child has the group
     };
     for (const Requests& round : rounds) {
         SCOPED_TRACE(&round - rounds);
-        ASSERT_EQ(world.entitle("holder", plist::Dictionary{{std::string(entitlementKeys::applicationGroups),
-                                                             plist::Array{"id"}}}),
+        const bool isChilds = &round == &rounds[2];
+        const plist::Dictionary groups{{std::string(entitlementKeys::applicationGroups), plist::Array{"id"}}};
+        ASSERT_EQ(isChilds ? world.entitle("child", groups, {{std::string(ipc::keys::parentBundleIdOption), "holder"}})
+                           : world.entitle("holder", groups),
                   ErrorCode::success);
         const FoundContainer holder = make("holder", false, bundle);
         const FoundContainer old = make("id", false, group);

@@ -8,6 +8,7 @@
 #include <charconv>
 #include <cstdlib>
 #include <cstring>
+#include <fcntl.h>
 
 namespace zorvanerun {
 
@@ -55,6 +56,11 @@ Result<PassedSockets> PassedSockets::ofCaller() {
                           " is no number of sockets that can be passed on, or their "
                           "names are too long",
                       "pass at most " + std::to_string(socketsMax) + " sockets");
+    for (int fd = firstPassed; fd < firstPassed + passed.count; ++fd)
+        if (::fcntl(fd, F_GETFD) < 0)
+            return failed("LISTEN_FDS=" + std::string(count) + ", but descriptor " + std::to_string(fd) +
+                              " is not open",
+                          "pass as many sockets as it says, or leave it away");
     if (names)
         passed.names = names;
     return passed;

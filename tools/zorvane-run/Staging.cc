@@ -56,21 +56,28 @@ public:
     [[nodiscard]] FileDescriptor place(const std::string& path, bool isFile) {
         for (std::size_t end = path.find('/', 1);; end = path.find('/', end + 1)) {
             const std::string part = path.substr(1, end == path.npos ? end : end - 1);
-            if (made_.insert(part).second && !make(part.c_str(), isFile && end == path.npos) && errno != EEXIST)
+            if (made_.insert(part).second && !make(part, isFile && end == path.npos) && errno != EEXIST)
                 return FileDescriptor();
             if (end == path.npos)
-                break;
+                return open(path.substr(1));
         }
-        auto opened = zor::platform::openBeneath(root_, path.c_str() + 1, O_PATH | O_NOFOLLOW);
+    }
+
+private:
+    [[nodiscard]] FileDescriptor open(const std::string& path) const {
+        auto opened = zor::platform::openBeneath(root_, path.c_str(), O_PATH | O_NOFOLLOW);
         if (opened)
             return std::move(*opened);
         errno = opened.error().number();
         return FileDescriptor();
     }
-
-private:
-    [[nodiscard]] bool make(const char* path, bool isFile) const {
-        return (isFile ? ::mknodat(root_, path, S_IFREG | 0444, 0) : ::mkdirat(root_, path, openMode)) == 0;
+    [[nodiscard]] bool make(const std::string& path, bool isFile) const {
+        // In its directory: the kernel would follow links on the way to a name further down.
+        const std::size_t slash = path.rfind('/');
+        const FileDescriptor directory = open(slash == path.npos ? "." : path.substr(0, slash));
+        const char* const name = path.c_str() + (slash == path.npos ? 0 : slash + 1);
+        return directory.valid() && (isFile ? ::mknodat(directory.get(), name, S_IFREG | 0444, 0)
+                                            : ::mkdirat(directory.get(), name, openMode)) == 0;
     }
 
     const int root_;

@@ -57,11 +57,12 @@ Result<Prepared> prepare(const Root& root, const Options& options) {
 /// Looks for an assertion before anything is made, and again when all is: that may have taken minutes. A launch that
 /// waited then prepares anew, for the containers may be others by now.
 Result<int> start(const Options& options) {
+    // Before anything is opened that could be taken for one of them.
+    const PassedSockets passed = TRY(PassedSockets::ofCaller());
     Notifications notifications = TRY(Notifications::ofCaller());
     if (const char* const failed = leaveMountNamespace())
         return std::unexpected(noSandbox(failed));
     const Root root = TRY(Root::open(options.root));
-    const PassedSockets passed = TRY(PassedSockets::ofCaller());
     TRY(passed.judge(root, options));
     (void)TRY(awaitFreedom(root, options));
     Supervisor supervisor = TRY(Supervisor::begin(options, passed));
