@@ -100,7 +100,7 @@ ErrorCode EntitlementChange::settle(Change change) {
 Result<void> EntitlementChange::removeEntitlementDictionariesForIdentifierAndItsChildren(
     const std::string& identifier, std::optional<Change>& change, const AllIdentifiersWriteLock& lock) {
     const std::vector<std::string> all = withChildren(identifier);
-    // Of all of them before the first goes: with an identifier the map forgets whose children the others are.
+    // All are asked before the first goes: with an identifier the map forgets whose children the others are.
     for (const std::string& one : all)
         TRY(refuseIfUnderWay(one, lock));
     for (const std::string& one : all) {
