@@ -219,6 +219,49 @@ TEST_F(Replace, ARecoveryThatStopsKeepsWhatItStillNeeds) {
     EXPECT_TRUE(isQuiet());
 }
 
+// Goal: a change of either container while a replace is prepared is not lost, and the journal names what moves. Method:
+// when the journal is made, the old one's directory gets another name, or the new one a value; then a launch.
+TEST_F(Replace, PreparesAnewWhatHasChanged) {
+    const std::string key = "k";
+    const plist::Value value(true);
+    for (const bool oldChanges : {true, false}) {
+        const std::string id = oldChanges ? "old.changes" : "new.changes";
+        const FoundContainer old = make(id, false);
+        const FoundContainer fresh = make(id, asTransient);
+        enum class Step { before, changes, after } step = Step::before;
+        world.disk().before = [&](const DiskCallInfo& call) {
+            const std::string moved = old.record->url().path();
+            const bool isJournals =
+                std::filesystem::exists(world.path(journals)) &&
+                std::filesystem::equivalent("/proc/self/fd/" + std::to_string(call.fd), world.path(journals));
+            ZORClientConnection& client = world.daemonsClient();
+            if (call.call == DiskCall::createFile && isJournals && step == Step::before) {
+                step = Step::changes;
+                if (oldChanges)
+                    EXPECT_TRUE(client.regenerateDirectoryUUIDForUser(addressOf(old)));
+                else
+                    EXPECT_TRUE(client.setInfoValue(&value, &key, addressOf(fresh), UseLocking::yes));
+                step = Step::after;
+            } else if (call.call == DiskCall::rename && call.subject.starts_with(nameOf(moved) + " -> ") &&
+                       step == Step::after) {
+                const auto names = world.names(journals);
+                EXPECT_TRUE(names.size() == 1 &&
+                            world.read(journals + "/" + names[0]).find(moved) != std::string::npos);
+            }
+        };
+        EXPECT_EQ(complaintOf(world.replace(&old, fresh, Preserve::yes)), "");
+        EXPECT_TRUE(step == Step::after && isQuiet());
+        world.disk().before = nullptr;
+        world.relaunch();
+        const auto found = world.find(id);
+        ASSERT_TRUE(found);
+        EXPECT_EQ(found->uuid, old.uuid);
+        EXPECT_EQ(contentOf(*found), "new");
+        EXPECT_EQ(world.daemonsClient().infoValueForKey(&key, addressOf(*found), UseLocking::yes).has_value(),
+                  !oldChanges);
+    }
+}
+
 // Goal: a sync that fails loses no container and brings none back; what is answered is so. Method: a file system
 // without order, on which the n-th sync of a replace fails, or all from there on, or memory runs out there; then a
 // deletion and a launch.
