@@ -53,6 +53,7 @@ TEST(RemoveTree, ClearsFlagsOfDirectoriesInsideTheTree) {
         {"top/tree/a/b/file", FS_APPEND_FL, "a/b/file:1 a/b:39 a:39 :39 ", EPERM},
         {"top/tree/a/b", FS_IMMUTABLE_FL, "+a/b ", 0},
         {"top/tree/a/b", FS_APPEND_FL, "+a/b ", 0},
+        {"top/tree/a/empty", FS_IMMUTABLE_FL, "+a/empty ", 0},
         {"top/tree", FS_IMMUTABLE_FL, "+ ", 0},
         {"top", FS_IMMUTABLE_FL, ":1 ", EPERM},
     };

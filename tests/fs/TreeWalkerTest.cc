@@ -115,6 +115,8 @@ TEST(TreeWalker, DoesNotCrossMounts) {
         makeFile(AT_FDCWD, tree + "/other/inside");
         // A descriptor from before belongs to the parent's mounts.
         const FileDescriptor root = openDirectory(world.path());
+        for (const char* path : {"..", "tree/..", "tree/../..", "/tree"})
+            EXPECT_EQ(platform::openBeneathOnMount(root.get(), path, O_PATH).error().number(), EXDEV) << path;
         TreeWalker walker;
         EXPECT_EQ(visits(walker, root.get(), "tree"),
                   (std::set<std::string>{"directory ", "directory loop (away)", "directory other (away)", "end ",
