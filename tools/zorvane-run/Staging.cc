@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Staging.h"
 
+#include "base/Try.h"
 #include "os/FileDescriptor.h"
 
 #include <cerrno>
@@ -56,28 +57,33 @@ public:
     [[nodiscard]] FileDescriptor place(const std::string& path, bool isFile) {
         for (std::size_t end = path.find('/', 1);; end = path.find('/', end + 1)) {
             const std::string part = path.substr(1, end == path.npos ? end : end - 1);
-            if (made_.insert(part).second && !make(part, isFile && end == path.npos) && errno != EEXIST)
-                return FileDescriptor();
+            if (made_.insert(part).second)
+                if (const zor::Errno failed = make(part, isFile && end == path.npos); failed && failed != EEXIST) {
+                    errno = failed.number();
+                    return FileDescriptor();
+                }
             if (end == path.npos)
-                return open(path.substr(1));
+                break;
         }
-    }
-
-private:
-    [[nodiscard]] FileDescriptor open(const std::string& path) const {
-        auto opened = zor::platform::openBeneath(root_, path.c_str(), O_PATH | O_NOFOLLOW);
+        auto opened = open(path.substr(1));
         if (opened)
             return std::move(*opened);
         errno = opened.error().number();
         return FileDescriptor();
     }
-    [[nodiscard]] bool make(const std::string& path, bool isFile) const {
+
+private:
+    [[nodiscard]] zor::ErrnoOr<FileDescriptor> open(const std::string& path) const {
+        return zor::platform::openBeneath(root_, path.c_str(), O_PATH | O_NOFOLLOW);
+    }
+    [[nodiscard]] zor::Errno make(const std::string& path, bool isFile) const {
         // In its directory: the kernel would follow links on the way to a name further down.
         const std::size_t slash = path.rfind('/');
-        const FileDescriptor directory = open(slash == path.npos ? "." : path.substr(0, slash));
+        const FileDescriptor directory = TRY(open(slash == path.npos ? "." : path.substr(0, slash)));
         const char* const name = path.c_str() + (slash == path.npos ? 0 : slash + 1);
-        return directory.valid() && (isFile ? ::mknodat(directory.get(), name, S_IFREG | 0444, 0)
-                                            : ::mkdirat(directory.get(), name, openMode)) == 0;
+        const int failed =
+            isFile ? ::mknodat(directory.get(), name, S_IFREG | 0444, 0) : ::mkdirat(directory.get(), name, openMode);
+        return failed != 0 ? zor::Errno::last() : zor::Errno();
     }
 
     const int root_;
