@@ -135,25 +135,6 @@ Scenario replacement(const std::string& name, OldOne kind, bool exchanges = true
     return scenario;
 }
 
-/// The new one is deleted as soon as it has the old one's place, and neither comes back.
-Scenario replacementAndDeletion() {
-    const auto fresh = std::make_shared<Acknowledged>();
-    Scenario scenario = changing(
-        "replace and deletion",
-        [=](Device& device, const Acknowledged&) { *fresh = makeWithContent(device, true, "new"); },
-        [=](Device& device, const Acknowledged& old) {
-            return device.client().replaceContainer(swap(old, *fresh, OldOne::replaced), StartDeletionThread::no) &&
-                   device.client().deleteContainerForUser(mobileUser, &changed.identifier, changed.containerClass,
-                                                          false) &&
-                   device.daemon->lookUp(changed).code == ErrorCode::notFound;
-        },
-        [](const std::string& root, bool acted, const Acknowledged&) -> std::string {
-            return acted && look(root).content != "missing" ? "a container came back" : "";
-        });
-    scenario.exchanges = false;
-    return scenario;
-}
-
 /// The old container waits in staging, the new one is where it was made, and their journal is on the disk.
 struct StoppedReplace {
     FileURL newUrl;
@@ -301,7 +282,6 @@ std::vector<Scenario> changeScenarios() {
     const std::string keeping = "replace that keeps the UUID";
     return {atHome(replacement(replace, OldOne::replaced)),
             atHome(replacement(replace + " without exchange", OldOne::replaced, false)),
-            atHome(replacementAndDeletion()),
             replacement(keeping, OldOne::replacedAndUuidKept),
             replacement("replace of nothing", OldOne::none),
             atHome(recovery(replace, OldOne::replaced)),

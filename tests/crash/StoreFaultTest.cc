@@ -211,9 +211,8 @@ TEST_P(HomePowerCutTest, StandsEveryCutBetweenFileSystems) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Store, StorePowerCutTest, ::testing::ValuesIn(allScenarios()), scenarioName);
-INSTANTIATE_TEST_SUITE_P(
-    Home, HomePowerCutTest,
-    ::testing::ValuesIn(homeScenarios({"replace", "replace without exchange", "replace and deletion"})), scenarioName);
+INSTANTIATE_TEST_SUITE_P(Home, HomePowerCutTest,
+                         ::testing::ValuesIn(homeScenarios({"replace", "replace without exchange"})), scenarioName);
 
 } // namespace
 } // namespace zor::support
