@@ -31,6 +31,8 @@ std::vector<Figure> measureTree(const Settings& settings);
 std::vector<Figure> measureReplace(const Settings& settings);
 /// Lookups while containers with many files are removed and measured: BusyBench.cc.
 std::vector<Figure> measureBusy(const Settings& settings);
+/// Lookups while others make, register, replace, wipe and delete: BesideBench.cc.
+std::vector<Figure> measureBeside(const Settings& settings);
 /// A directory becomes the content of a container: InstallBench.cc.
 std::vector<Figure> measureInstall(const Settings& settings);
 /// The first launch after a boot: BootBench.cc.

@@ -3,11 +3,10 @@
 // container measured again and again, against lookups alone in the same daemon, before and after.
 #include "Benchmarks.h"
 #include "ContentTree.h"
+#include "Writers.h"
 
 #include <algorithm>
 #include <atomic>
-#include <exception>
-#include <thread>
 
 namespace zor::bench {
 
@@ -16,39 +15,6 @@ namespace {
 constexpr ContainerClass containerClass = ContainerClass::dataApplication;
 /// Lookups leave a removal, which has a lower priority, little of two processors: it is not waited for.
 constexpr double secondsMax = 15;
-
-/// Work of other clients, on a thread of its own; what it throws comes out of `wait`.
-class OtherClient {
-public:
-    template <typename Work>
-    explicit OtherClient(Work&& work)
-        : thread_([this, work = std::forward<Work>(work)] {
-              try {
-                  work();
-              } catch (...) {
-                  failure_ = std::current_exception();
-              }
-              ended_ = true;
-          }) {}
-    ~OtherClient() {
-        if (thread_.joinable())
-            thread_.join();
-    }
-    OtherClient(const OtherClient&) = delete;
-    OtherClient& operator=(const OtherClient&) = delete;
-
-    [[nodiscard]] bool ended() const { return ended_; }
-    void wait() {
-        thread_.join();
-        if (failure_)
-            std::rethrow_exception(failure_);
-    }
-
-private:
-    std::atomic<bool> ended_{false};
-    std::exception_ptr failure_;
-    std::thread thread_;
-};
 
 } // namespace
 

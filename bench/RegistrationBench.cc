@@ -3,6 +3,7 @@
 // registration is its own. Both against a lookup in the same daemon, on one processor.
 #include "Benchmarks.h"
 #include "RoundTripPairs.h"
+#include "Writers.h"
 
 #include "ipc/Protocol.h"
 #include "platform/Service.h"
@@ -16,15 +17,6 @@ namespace zor::bench {
 namespace {
 
 namespace keys = ipc::keys;
-
-Frame registration(const std::string& identifier, plist::Dictionary entitlements, plist::Dictionary options) {
-    return requestFrame({
-        {std::string(keys::command), static_cast<std::uint64_t>(ipc::Command::processEntitlements)},
-        {std::string(keys::identifier), identifier},
-        {std::string(keys::entitlements), std::move(entitlements)},
-        {std::string(keys::optionsDictionary), std::move(options)},
-    });
-}
 
 /// The reply to a request that is to succeed.
 Frame firstReply(Client& client, const Frame& request) {

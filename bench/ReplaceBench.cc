@@ -3,6 +3,7 @@
 // the same things in the same order; and what a bundle takes, asked for the second time, against a lookup.
 #include "Benchmarks.h"
 #include "RoundTripPairs.h"
+#include "Writers.h"
 
 #include <chrono>
 #include <fcntl.h>
@@ -18,6 +19,7 @@ namespace {
 using platform::FileDescriptor;
 
 constexpr ContainerClass containerClass = ContainerClass::bundleApplication;
+constexpr const char* identifier = "com.example.application.replaced";
 constexpr std::size_t journalBytes = 700; // about what four paths take
 constexpr std::size_t metadataBytes = 400;
 
@@ -82,38 +84,6 @@ private:
     std::string old_ = "first";
 };
 
-class Replacer {
-public:
-    explicit Replacer(const Daemon& daemon)
-        : client_(daemon.connect()), old_(makeContainer(client_, identifier_, containerClass)) {}
-
-    double replace() {
-        const Container fresh = makeContainer(client_, identifier_, containerClass, Lifetime::transient);
-        const Frame request =
-            requestFrame({{std::string(ipc::keys::command), static_cast<std::uint64_t>(ipc::Command::replaceContainer)},
-                          {std::string(ipc::keys::oldContainerUUID), old_.uuid},
-                          {std::string(ipc::keys::oldContainerClass), static_cast<std::uint64_t>(containerClass)},
-                          {std::string(ipc::keys::oldIdentifier), identifier_},
-                          {std::string(ipc::keys::oldContainerUserId), userOf(containerClass)},
-                          {std::string(ipc::keys::newContainerUUID), fresh.uuid},
-                          {std::string(ipc::keys::newContainerClass), static_cast<std::uint64_t>(containerClass)},
-                          {std::string(ipc::keys::newIdentifier), identifier_},
-                          {std::string(ipc::keys::newContainerUserId), userOf(containerClass)}});
-        const auto begin = Clock::now();
-        const auto reply = client_.exchange(request);
-        const double microseconds = secondsSince(begin) * 1e6;
-        if (replyOf(reply).unsignedInteger(ipc::keys::replyError) != ipc::replySuccess)
-            throw Failure("a container was not replaced");
-        old_ = fresh;
-        return microseconds;
-    }
-
-private:
-    const std::string identifier_ = "com.example.application.replaced";
-    Client client_;
-    Container old_;
-};
-
 template <typename Maker>
 std::vector<double> block(Maker& maker, int count) {
     std::vector<double> microseconds;
@@ -136,7 +106,7 @@ double syncsOfReplace(const Settings& settings) {
     for (int i = 0; i < replaces; ++i)
         (void)makeContainer(client, text("com.example.%d", i), containerClass, Lifetime::transient);
     const long made = counter.count() - before;
-    Replacer replacer(daemon);
+    Replacer replacer(daemon, identifier);
     const long middle = counter.count();
     (void)block(replacer, replaces);
     return static_cast<double>(counter.count() - middle - made) / replaces;
@@ -146,7 +116,7 @@ Figure replaceFigure(const Settings& settings) {
     const Place place(*settings.scratch, "replace", {.bytes = std::uint64_t{512} << 20, .inodes = 65536});
     prepareRoot(settings, place.path());
     const Daemon daemon(settings, place.path(), {.syncs = Daemon::Syncs::on});
-    Replacer replacer(daemon);
+    Replacer replacer(daemon, identifier);
     ReplaceFloor floor(place.path());
     const int each = settings.rounds(20, 10);
     const RoundTripPairs pairs = roundTripsInTurns(
@@ -166,7 +136,6 @@ Figure replaceFigure(const Settings& settings) {
 constexpr std::chrono::seconds bundleSettled{11};
 
 Figure bundleUsageFigure(const Settings& settings) {
-    const std::string identifier = "com.example.application.bundle";
     const Place place(*settings.scratch, "bundle", {.bytes = std::uint64_t{256} << 20, .inodes = 16384});
     prepareRoot(settings, place.path());
     const int processor = measuringProcessor();

@@ -29,7 +29,7 @@ Measures the daemon beside this program and prints each figure with its goal.
 
   --quick       fewer repetitions and smaller stores; under a minute
   --only NAME   one group: lookup, registration, throughput, upcall, create, class,
-                protection, boot, tree, replace, busy,
+                protection, boot, tree, replace, busy, beside,
                 install, start, endurance, run
   --json FILE   write the figures to FILE, too
 
@@ -58,6 +58,7 @@ constexpr Group groups[] = {
     {"tree", measureTree},
     {"replace", measureReplace},
     {"busy", measureBusy},
+    {"beside", measureBeside},
     {"install", measureInstall},
     {"start", measureStart},
     {"endurance", measureEndurance},
