@@ -142,7 +142,8 @@ std::vector<Figure> measureBeside(const Settings& settings) {
     mustSucceed(first, true);
     const Frame found(first.begin(), first.end());
     const auto beside = [&](const std::vector<Change>& wanted) {
-        Beside times{.before = roundTrips(client, lookup, found, alone)};
+        Beside times;
+        times.before = roundTrips(client, lookup, found, alone);
         Changes changes(daemon, wanted);
         const auto begin = Clock::now();
         while (secondsSince(begin) < seconds)
