@@ -59,6 +59,8 @@ void ZORGroupManager::prepare(const std::string& identifier) {
 }
 
 Result<void> ZORGroupManager::refuseIfUnderWay(const std::string& identifier, const AllIdentifiersWriteLock& /*held*/) {
+    if (needs_.recovery.underWay().noneUnderWay())
+        return {}; // the groups need not be put together
     const UserNumbers& users = needs_.configuration.users();
     const auto refuse = [&](GroupType type, const Identifiers& groups, std::uint32_t first,
                             std::uint32_t last) -> Result<void> {

@@ -172,7 +172,7 @@ void WaitingReplaces::end(const FileURL& journalUrl, Ended how) noexcept {
 
 bool WaitingReplaces::isUnderWay(std::uint32_t userId, ContainerClass containerClass,
                                  std::string_view identifier) const {
-    if (noneUnderWay_.load(std::memory_order_acquire))
+    if (noneUnderWay())
         return false;
     const MutexLock held(mutex_);
     return std::ranges::any_of(underWay_, [&](const UnderWay& one) {

@@ -94,6 +94,7 @@ public:
     void end(const FileURL& journalUrl, Ended how) noexcept;
     [[nodiscard]] bool isUnderWay(std::uint32_t userId, ContainerClass containerClass,
                                   std::string_view identifier) const;
+    [[nodiscard]] bool noneUnderWay() const { return noneUnderWay_.load(std::memory_order_acquire); }
     /// How many have ended. A caller that met one under way after it had asked waits until there are more.
     [[nodiscard]] std::uint64_t ended() const;
     void awaitMoreThan(std::uint64_t ended) const;

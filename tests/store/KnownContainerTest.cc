@@ -147,6 +147,58 @@ TEST_F(Known, RetryTestCountsDown) {
     }
 }
 
+// Goal: nobody waits for the disk under the lock of all identifiers. Method: whether somebody holds it at each sync
+// that an operation makes, on file systems that keep an order and on those that keep none.
+TEST(Syncs, AreWaitedForWithoutTheLock) {
+    using plist::Dictionary;
+    const std::string id = "com.example";
+    const Dictionary groups{{std::string(entitlementKeys::applicationGroups), plist::Array{"group"}},
+                            {std::string(entitlementKeys::systemContainer), true}};
+    const auto registers = [&](World& world, const Dictionary& entitlements) {
+        return world.entitle(id, entitlements) == ErrorCode::success;
+    };
+    const auto deletes = [&](World& world, ContainerClass containerClass) {
+        return world.stage(*world.find(id, containerClass)) == ErrorCode::success;
+    };
+    const std::pair<const char*, std::function<bool(World&)>> rows[] = {
+        {"creation", [](World& world) { return world.create("new").has_value(); }},
+        {"registration", [&](World& world) { return registers(world, Dictionary{{"k", 1}}); }},
+        {"deletion of a bundle", [&](World& world) { return deletes(world, ContainerClass::bundleApplication); }},
+        {"deletion", [&](World& world) { return deletes(world, application); }},
+    };
+    for (const auto& [name, operation] : rows)
+        for (const auto ordering : {fs::Ordering::journal, fs::Ordering::none}) {
+            SCOPED_TRACE(name);
+            World world({.probe = ordering == fs::Ordering::journal ? [](int) { return fs::Ordering::journal; }
+                                                                    : [](int) { return fs::Ordering::none; }});
+            world.write(groupMarkerPath, "");
+            world.load();
+            ASSERT_TRUE(registers(world, groups));
+            const std::string gone[] = {world.make("group", ContainerClass::sharedAppGroup).path,
+                                        world.make(id, ContainerClass::dataSystem).path};
+            for (const ContainerClass containerClass : {ContainerClass::bundleApplication, application})
+                (void)world.make(id, containerClass);
+            world.services().cache().dropAll(); // as after a start: class directories are read, and synced
+            int syncs = 0;
+            int held = 0;
+            world.disk().before = [&, mine = std::this_thread::get_id()](const support::DiskCallInfo& call) {
+                const bool isSync = call.call == DiskCall::sync || call.call == DiskCall::syncFileSystem;
+                if (!isSync || std::this_thread::get_id() != mine)
+                    return;
+                ++syncs;
+                held += world.services().locks().quietGeneration() ? 0 : 1;
+            };
+            EXPECT_TRUE(operation(world));
+            world.drainDeathRow(); // its thread asks the disk, too
+            world.disk().before = nullptr;
+            EXPECT_GT(syncs, 0);
+            EXPECT_EQ(held, 0);
+            const bool releases = &operation == &rows[1].second || &operation == &rows[2].second;
+            for (const std::string& path : gone)
+                EXPECT_EQ(isThere(path), !releases);
+        }
+}
+
 // Goal: a class directory that is slow keeps nobody else, and what was read counts only as far as nothing has changed.
 // Method: while one is read for the first time, and while one is looked over, what others do.
 TEST_F(Known, ASlowDirectoryKeepsNobodyElse) {
