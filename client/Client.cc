@@ -402,13 +402,20 @@ Result<Client::GroupPaths> Client::groupContainerPaths(std::uint32_t user, const
 }
 
 Result<Client::SharedContainers> Client::sharedContainers(std::uint32_t user, const std::string& identifier) {
-    const plist::Dictionary requests[] = {groupsRequest(user, identifier),
-                                          about(ipc::Command::getSystemGroupContainerPaths, identifier),
-                                          about(ipc::Command::getSystemContainerPath, identifier)};
+    plist::Dictionary requests[] = {groupsRequest(user, identifier),
+                                    about(ipc::Command::getSystemGroupContainerPaths, identifier),
+                                    about(ipc::Command::getSystemContainerPath, identifier)};
+    requests[0].set(keys::passedSockets, true);
     auto replies = connection_->callTogether(requests);
+    const plist::Value* const passed = replies[0] ? replies[0]->find(keys::replyPassedSockets) : nullptr;
+    const bool* const mayBePassed = passed ? passed->asBoolean() : nullptr;
+    const std::optional<bool> passedSockets = mayBePassed ? std::optional(*mayBePassed) : std::nullopt;
     auto applicationGroups = TRY(groupPathsIn(std::move(replies[0])));
     auto systemGroups = TRY(groupPathsIn(std::move(replies[1])));
-    SharedContainers shared{.applicationGroups = std::move(applicationGroups), .systemGroups = std::move(systemGroups)};
+    SharedContainers shared{.applicationGroups = std::move(applicationGroups),
+                            .systemGroups = std::move(systemGroups),
+                            .systemContainer = {},
+                            .passedSockets = passedSockets};
     auto path = pathIn(std::move(replies[2]));
     if (path)
         shared.systemContainer = std::move(*path);

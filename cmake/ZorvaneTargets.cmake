@@ -95,8 +95,9 @@ function(zor_program name)
     add_executable(${name} ${sources})
     zor_use_pch(${name})
     target_link_libraries(${name} PRIVATE zor_options ${ARG_LINK})
-    # A device takes a program with its C++ runtime inside; a distribution, and a sanitizer, have a shared one.
-    target_link_options(${name} PRIVATE -Wl,-z,relro,-z,now
+    # A device takes a program with its C++ runtime inside; a distribution, and a sanitizer, have a shared one. A program loads no
+    # library of those that it may use (the daemon's XML reader) unless it does.
+    target_link_options(${name} PRIVATE -Wl,-z,relro,-z,now,--as-needed
         $<$<BOOL:${ZORVANE_STATIC_RUNTIME}>:-static-libstdc++;-static-libgcc>)
 endfunction()
 

@@ -4,8 +4,8 @@
 namespace zor {
 
 Operations::Operations(const Store& store, const platform::Platform& platform)
-    : configuration(store.configuration), internalBuild(platform.internalBuild), setup(store.boundary),
-      whitelist(ZORWhitelist::forSystem(store.log, store.fileManager)),
+    : configuration(store.configuration), internalBuild(platform.internalBuild), peers(platform.peers),
+      setup(store.boundary), whitelist(ZORWhitelist::forSystem(store.log, store.fileManager)),
       markers(store.log, store.fileManager, store.configuration, platform.systemVersion),
       entitlements(store.log, store.fileManager, store.configuration, markers),
       moves(store.log, store.fileManager, store.durability), mappings(store.log, platform.sandbox),

@@ -53,6 +53,7 @@ struct Operations {
 
     ZORGlobalConfiguration& configuration;
     const platform::InternalBuildQuery& internalBuild;
+    platform::PeerIdentity& peers;
     StoreLimits limits{};
     SetupReport setup;
     const ZORWhitelist whitelist;

@@ -5,6 +5,7 @@
 #include "os/CoarseClock.h"
 #include "os/FileDescriptor.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <charconv>
 #include <climits>
@@ -343,6 +344,14 @@ std::unique_ptr<Peer> LinuxPeerIdentity::peerOfSocket(int socket) {
                                                            .executable = executable,
                                                            .securityLabel = securityLabelOf(socket)},
                                        registry_);
+}
+
+bool LinuxPeerIdentity::allowsPassedSockets(std::string_view identifier) {
+    registry_.takeNotices();
+    const auto snapshot = registry_.snapshot();
+    return std::ranges::any_of(snapshot->entries, [&](const IdentityRegistry::Registered& registered) {
+        return registered.entry->passedSockets && registered.entry->grant->identifier == identifier;
+    });
 }
 
 } // namespace zor::platform

@@ -116,6 +116,7 @@ public:
     /// The peer must not outlive this object.
     [[nodiscard]] std::unique_ptr<Peer> peerOfSocket(int socket) override;
     [[nodiscard]] bool ownsRoot(uid_t uid) const override { return uid == 0 || uid == daemonUserId_; }
+    [[nodiscard]] bool allowsPassedSockets(std::string_view identifier) override;
 
 private:
     IdentityRegistry& registry_;

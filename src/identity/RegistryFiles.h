@@ -30,7 +30,7 @@ struct RegistryEntry {
     std::optional<std::vector<std::uint32_t>> userIds;
     std::optional<std::string> unit;
     std::optional<std::string> securityLabel;
-    /// The identifier's programs may be given sockets that a service manager opened. The launcher's to ask.
+    /// The identifier's programs may be given sockets that a service manager opened. No power of the client.
     bool passedSockets = false;
     /// Never nullptr.
     std::shared_ptr<const IdentityGrant> grant;

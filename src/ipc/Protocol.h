@@ -146,6 +146,7 @@ inline constexpr std::string_view optionsDictionary = "OptionsDictionary";      
 inline constexpr std::string_view dataProtectionClass = "DataProtectionClass";     // signed 64-bit integer
 inline constexpr std::string_view isThirdParty = "IsThirdParty";                   // boolean
 inline constexpr std::string_view retryIfLocked = "RetryIfLocked";                 // boolean
+inline constexpr std::string_view passedSockets = "PassedSockets";                 // boolean: asks for the reply's
 
 // Options of processEntitlements.
 inline constexpr std::string_view parentBundleIdOption = "com.veltra.Zorvane.ParentBundleID"; // string
@@ -169,6 +170,7 @@ inline constexpr std::string_view replyInfoDictionary = "ReplyInfoDictionary";  
 inline constexpr std::string_view replyDiskUsage = "ReplyDiskUsage";                         // u64, bytes
 inline constexpr std::string_view replyGroupContainerDict = "ReplyGroupContainerDict";       // identifier to path
 inline constexpr std::string_view replyGroupIdentifiersArray = "ReplyGroupIdentifiersArray"; // array
+inline constexpr std::string_view replyPassedSockets = "ReplyPassedSockets";                 // boolean
 
 // The status reply.
 inline constexpr std::string_view statusPeer = "Peer";                             // dictionary

@@ -98,6 +98,8 @@ public:
     [[nodiscard]] virtual std::unique_ptr<Peer> peerOfSocket(int socket) = 0;
     /// Whether this kernel uid counts as the owner of the root: root, or the daemon's own user.
     [[nodiscard]] virtual bool ownsRoot(uid_t uid) const = 0;
+    /// Whether programs of the identifier may be given sockets that a service manager opened. Any thread.
+    [[nodiscard]] virtual bool allowsPassedSockets(std::string_view identifier) = 0;
 };
 
 class RunLoop;

@@ -42,6 +42,7 @@ public:
         return std::make_unique<KernelPeer>(*this, credentials);
     }
     bool ownsRoot(uid_t uid) const override { return !owner || uid == *owner; }
+    bool allowsPassedSockets(std::string_view) override { return false; }
 
     /// Everybody when there is none.
     std::optional<uid_t> owner;

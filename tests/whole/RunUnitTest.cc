@@ -2,6 +2,7 @@
 // zorvane-run as the main process of a unit: the states that settings of the unit make, signals, passed sockets, and
 // its words to the service manager. Real daemon, real sandboxes.
 #include "os/SystemCallFilter.h"
+#include "process/Relay.h"
 #include "support/Frames.h"
 #include "whole/Launcher.h"
 
@@ -131,20 +132,27 @@ TEST(RunInAUnit, Descriptors) {
     ASSERT_EQ(::listen(listener, 1), 0);
     const std::string fifo = launcher.daemon.path("fifo");
     ASSERT_EQ(::mkfifo(fifo.c_str(), 0666), 0);
-    const auto start = [&](const Words& words, int passed, bool toIt = true) {
-        return Program(launcher.words(notes, words), [=] {
+    const auto start = [&](const Words& words, int passed, bool toIt = true, const std::string& root = "") {
+        const Words at = root.empty() ? Words() : Words{"--root", root};
+        return Program(launcher.words(notes, at + words), [=] {
             const std::string process = std::to_string(::getpid() + (toIt ? 0 : 1));
             return ::dup2(passed, 3) == 3 && ::fcntl(3, F_SETFD, 0) == 0 &&
                    ::setenv("LISTEN_PID", process.c_str(), 1) == 0 && ::setenv("LISTEN_FDS", "1", 1) == 0 &&
                    ::setenv("LISTEN_FDNAMES", "web", 1) == 0;
         });
     };
+    launcher.daemon.registerProgram("40-maps", "/usr/bin/true", "<key>PassedSockets</key><true/>", maps);
     Program notAllowed = start({"--", "true"}, listener);
     expectEnd(notAllowed, 125, "no entry of the registry allows that");
     Program another =
         start({"--", "sh", "-c", "test -z \"$LISTEN_FDS\" && test ! -e /proc/self/fd/3"}, listener, false);
     expectEnd(another, 0, "");
     launcher.daemon.registerProgram("40-notes", "/usr/bin/true", "<key>PassedSockets</key><true/>", notes);
+    const Relay older(
+        launcher.daemon, [](ipc::Command) { return Fate::passedOn; },
+        [](Relay::Message, plist::Dictionary& message) { message.erase(ipc::keys::replyPassedSockets); });
+    Program untold = start({"--", "true"}, listener, true, older.root());
+    expectEnd(untold, 125, "does not say whether that is allowed");
     const struct {
         const char* what;
         int fd;

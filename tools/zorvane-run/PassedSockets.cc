@@ -2,8 +2,6 @@
 #include "PassedSockets.h"
 
 #include "Descriptors.h"
-#include "base/Try.h"
-#include "identity/RegistryFiles.h"
 
 #include <charconv>
 #include <cstdlib>
@@ -21,22 +19,6 @@ constexpr std::size_t namesBytesMax = std::size_t{socketsMax} * 256;
 
 std::unexpected<Failure> failed(std::string what, std::string advice) {
     return std::unexpected(Failure{.what = std::move(what), .advice = std::move(advice)});
-}
-
-/// Whether a file of the registry that may be believed allows it; files that may not say nothing.
-Result<bool> isAllowed(const Root& root, const std::string& identifier) {
-    const auto system = zor::platform::SystemRoot::open(root.path);
-    if (!system)
-        return failed(withReason("cannot open the root " + root.path, system.error()), "name the daemon's root with "
-                                                                                       "--root");
-    const zor::platform::RegistryDirectory registry(*system, ::geteuid());
-    const auto listing = registry.list();
-    for (const auto& [name, stamp] : listing.files) {
-        const auto entry = registry.read(listing, name);
-        if (entry && entry->passedSockets && entry->grant->identifier == identifier)
-            return true;
-    }
-    return false;
 }
 
 } // namespace
@@ -66,20 +48,27 @@ Result<PassedSockets> PassedSockets::ofCaller() {
     return passed;
 }
 
-Result<void> PassedSockets::judge(const Root& root, const Options& options) const {
-    if (count == 0)
-        return {};
-    if (!TRY(isAllowed(root, options.identifier)))
-        return failed(std::to_string(count) + " sockets were passed for " + options.identifier +
-                          ", and no entry of the registry allows that",
-                      "give an entry of etc/zorvane/identities.d with that Identifier the key PassedSockets, or take "
-                      "the sockets away from the unit");
+Result<void> PassedSockets::judgeKinds(Network network) const {
     for (int fd = firstPassed; fd < firstPassed + count; ++fd)
-        if (const char* const why = whyPassedRefused(fd, options.network))
+        if (const char* const why = whyPassedRefused(fd, network))
             return failed("the passed descriptor " + std::to_string(fd) + " " + why,
                           "pass Unix sockets that listen or are connected, or pipes with names; for a socket of the "
                           "network, add --network host: a program can connect it to anything there");
     return {};
+}
+
+Result<void> PassedSockets::judgeAllowed(std::optional<bool> allowed, const std::string& identifier) const {
+    if (count == 0 || allowed.value_or(false))
+        return {};
+    const std::string what = std::to_string(count) + " sockets were passed for " + identifier + ", and ";
+    if (!allowed)
+        return failed(
+            what + "zorvaned does not say whether that is allowed: it is older than this program",
+            "start the zorvaned that came with this program (systemctl restart zorvaned), or take the sockets "
+            "away from the unit");
+    return failed(what + "no entry of the registry allows that",
+                  "give an entry of etc/zorvane/identities.d with that Identifier the key PassedSockets, or take the "
+                  "sockets away from the unit");
 }
 
 std::vector<std::string> PassedSockets::environment() const {

@@ -71,7 +71,7 @@ Result<bool> chooseSystemContainer(bool registered, const Options& options) {
 
 } // namespace
 
-Result<WantedContainers> chooseContainers(const Options& options) {
+Result<WantedContainers> chooseContainers(const Options& options, const PassedSockets& passed) {
     const std::string what = "cannot look for the groups and the system container of " + options.identifier;
     auto client = zorvane::Client::connect({.root = options.root, .timeoutMilliseconds = answerMilliseconds});
     if (!client)
@@ -79,6 +79,7 @@ Result<WantedContainers> chooseContainers(const Options& options) {
     const auto shared = client->sharedContainers(options.user, options.identifier);
     if (!shared)
         return std::unexpected(failureOf(shared.error(), what));
+    TRY(passed.judgeAllowed(shared->passedSockets, options.identifier));
     auto applicationGroups =
         TRY(choose(shared->applicationGroups, options.applicationGroups, "application", "--app-group", options));
     auto systemGroups = TRY(choose(shared->systemGroups, options.systemGroups, "system", "--system-group", options));

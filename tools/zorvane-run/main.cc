@@ -44,8 +44,8 @@ struct Prepared {
     std::vector<Mount> mounts;
 };
 
-Result<Prepared> prepare(const Root& root, const Options& options) {
-    const WantedContainers wanted = TRY(chooseContainers(options));
+Result<Prepared> prepare(const Root& root, const Options& options, const PassedSockets& passed) {
+    const WantedContainers wanted = TRY(chooseContainers(options, passed));
     if (hasControlCharacters(wanted, options.identifier))
         return std::unexpected(
             Failure{.what = "an identifier holds control characters", .advice = "register groups under other names"});
@@ -63,11 +63,11 @@ Result<int> start(const Options& options) {
     if (const char* const failed = leaveMountNamespace())
         return std::unexpected(noSandbox(failed));
     const Root root = TRY(Root::open(options.root));
-    TRY(passed.judge(root, options));
+    TRY(passed.judgeKinds(options.network));
     (void)TRY(awaitFreedom(root, options));
     Supervisor supervisor = TRY(Supervisor::begin(options, passed));
     for (;;) {
-        const Prepared prepared = TRY(prepare(root, options));
+        const Prepared prepared = TRY(prepare(root, options, passed));
         if (TRY(awaitFreedom(root, options)) == Freedom::waitedFor)
             continue;
         const char* failed = stage(prepared.mounts);
@@ -97,7 +97,7 @@ Result<int> run(const Options& options) {
     if (!options.dryRun)
         return start(options);
     const Root root = TRY(Root::open(options.root));
-    const Prepared prepared = TRY(prepare(root, options));
+    const Prepared prepared = TRY(prepare(root, options, {}));
     return showPlan(options, prepared.mounts, prepared.told);
 }
 

@@ -175,6 +175,9 @@ public:
         GroupPaths systemGroups;
         /// Nothing where the identifier is not entitled to one.
         std::optional<std::string> systemContainer;
+        /// Whether its programs may be given sockets that a service manager opened. Nothing where the daemon is of a
+        /// version that does not say.
+        std::optional<bool> passedSockets;
     };
     [[nodiscard]] Result<SharedContainers> sharedContainers(std::uint32_t user, const std::string& identifier);
     /// Codes 55: the caller is not entitled to the group; 21: it has no container.

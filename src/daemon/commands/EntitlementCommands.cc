@@ -69,8 +69,15 @@ bool isDictionaryOrAbsent(CommandContext& context, std::string_view key) {
 } // namespace
 
 void getGroupContainerPaths(CommandContext& context) {
-    if (const auto user = userOf(context, keys::userId, ContainerClass::sharedAppGroup))
-        replyWithGroupPaths(context, *user);
+    const auto user = userOf(context, keys::userId, ContainerClass::sharedAppGroup);
+    if (!user)
+        return;
+    replyWithGroupPaths(context, *user);
+    // The launcher asks with this command, before it starts a program of the identifier.
+    const std::string* identifier = ownIdentifierByDefault(context);
+    if (context.error == ErrorCode::success && context.request.isTrue(keys::passedSockets))
+        context.reply.set(keys::replyPassedSockets,
+                          identifier && context.operations.peers.allowsPassedSockets(*identifier));
 }
 
 void getGroupContainerIdentifiers(CommandContext& context) {
