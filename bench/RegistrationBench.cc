@@ -7,7 +7,7 @@
 
 #include "ipc/Protocol.h"
 #include "platform/Service.h"
-#include "store/Names.h"
+#include "store/StorePlaces.h"
 #include "store/ZOREntitlementMapping.h"
 
 #include <sys/stat.h>

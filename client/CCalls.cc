@@ -2,7 +2,7 @@
 // Calls of the C interface that wait, their errors and results, and what needs no daemon.
 #include "CInterface.h"
 
-#include "base/Try.h"
+#include "platform/Errno.h"
 #include "plist/Text.h"
 
 #include <algorithm>

@@ -2,7 +2,7 @@
 // Requests of the C interface: each judges and copies its arguments, and says which call of the client carries it out.
 #include "CInterface.h"
 
-#include "base/Try.h"
+#include "platform/Errno.h"
 #include "plist/Text.h"
 
 #include <utility>

@@ -3,9 +3,9 @@
 #include "zorvane/Client.h"
 
 #include "Connection.h"
-#include "base/Try.h"
 #include "ipc/Identifiers.h"
 #include "ipc/Protocol.h"
+#include "platform/Errno.h"
 
 #include <charconv>
 #include <iterator>

@@ -2,9 +2,9 @@
 #include "Connection.h"
 
 #include "Diagnosis.h"
-#include "base/Try.h"
 #include "ipc/Frame.h"
 #include "ipc/Protocol.h"
+#include "platform/Errno.h"
 #include "plist/Codec.h"
 
 #include <algorithm>

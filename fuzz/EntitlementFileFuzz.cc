@@ -4,9 +4,9 @@
 // the fuzzer.
 #include "daemon/Composition.h"
 #include "daemon/LinuxPlatform.h"
-#include "fs/AtomicFile.h"
+#include "fs/Durability.h"
 #include "fs/Trees.h"
-#include "store/Names.h"
+#include "store/StorePlaces.h"
 
 #include <algorithm>
 #include <cstdio>

@@ -3,10 +3,35 @@
 
 #include "plist/Text.h"
 
+#include <cstdio>
 #include <utility>
 #include <vector>
 
 namespace zor {
+
+std::string formattedList(const char* format, std::va_list arguments) {
+    std::va_list again;
+    va_copy(again, arguments);
+    char small[512];
+    const int length = std::vsnprintf(small, sizeof small, format, arguments);
+    std::string text;
+    if (length >= 0 && static_cast<std::size_t>(length) < sizeof small) {
+        text.assign(small, static_cast<std::size_t>(length));
+    } else if (length >= 0) {
+        text.resize(static_cast<std::size_t>(length));
+        std::vsnprintf(text.data(), text.size() + 1, format, again);
+    }
+    va_end(again);
+    return text;
+}
+
+std::string formatted(const char* format, ...) {
+    std::va_list arguments;
+    va_start(arguments, format);
+    std::string text = formattedList(format, arguments);
+    va_end(arguments);
+    return text;
+}
 
 namespace {
 
@@ -88,12 +113,6 @@ Log::ClientScope::ClientScope(std::uint32_t userId) : outer_(provokingUserId) {
 
 Log::ClientScope::~ClientScope() {
     provokingUserId = outer_;
-}
-
-bool Log::writes(int level) const {
-    if (!sink_.isOpen())
-        return level <= logLevelNotice;
-    return sink_.level() >= level;
 }
 
 void Log::write(int level, const char* function, const char* format, ...) const noexcept {

@@ -10,8 +10,7 @@
 // lost, and counted.
 #pragma once
 
-#include "base/ErrorCode.h"
-#include "base/Format.h"
+#include "ipc/Protocol.h"
 #include "platform/Process.h"
 
 #include <atomic>
@@ -23,6 +22,12 @@
 #include <string_view>
 
 namespace zor {
+
+// Texts made with formats that the compiler checks. Any thread.
+
+/// Formats into a string.
+std::string formatted(const char* format, ...) __attribute__((format(printf, 1, 2)));
+std::string formattedList(const char* format, std::va_list arguments) __attribute__((format(printf, 1, 0)));
 
 /// The subject of a thread's log lines, for sinks that keep more of a line than its text. Costs nothing until a line is
 /// written; each thread has its own.
@@ -80,7 +85,9 @@ public:
 
     void limitRefusals(RefusalGate gate) { refusalGate_ = std::move(gate); }
 
-    [[nodiscard]] bool writes(int level) const;
+    [[nodiscard]] bool writes(int level) const {
+        return sink_.isOpen() ? level <= sink_.level() : level <= logLevelNotice;
+    }
     void write(int level, const char* function, const char* format, ...) const noexcept
         __attribute__((format(printf, 4, 5)));
     void writeList(int level, const char* function, const char* format, std::va_list arguments) const noexcept

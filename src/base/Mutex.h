@@ -1,6 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// Mutexes that clang's thread-safety analysis understands. The lint build turns every access to guarded state outside
-// its lock into an error, so state is declared beside its mutex with ZOR_GUARDED_BY.
+// How threads of the daemon wait: for a mutex, for each other, and with a word to the pool that they belong to.
 #pragma once
 
 #include <chrono>
@@ -23,6 +22,9 @@
 #define ZOR_NO_THREAD_SAFETY_ANALYSIS ZOR_THREAD_ATTRIBUTE(no_thread_safety_analysis)
 
 namespace zor::platform {
+
+// Mutexes that clang's thread-safety analysis understands. The lint build turns every access to guarded state outside
+// its lock into an error, so state is declared beside its mutex with ZOR_GUARDED_BY.
 
 class ZOR_CAPABILITY("mutex") Mutex {
 public:
@@ -85,6 +87,45 @@ public:
 
 private:
     std::condition_variable condition_;
+};
+
+// Says that this thread is about to wait for something slow: a lock that is taken, a sync, the build of a large cache.
+//
+// The pool that serves clients keeps about as many threads running as there are processors. A thread that waits inside
+// a handler is not running, so the pool lets another one take its place while a scope is open. On a thread that belongs
+// to no pool a scope does nothing.
+
+/// Implemented by whoever owns the thread.
+class BlockingObserver {
+public:
+    virtual ~BlockingObserver() = default;
+    // They do not fail: who opens a scope may have counted himself already as one that waits.
+    virtual void willBlock() noexcept = 0;
+    virtual void didBlock() noexcept = 0;
+
+    /// Makes `observer` (or nobody, with nullptr) the one that the scopes of this thread tell.
+    static void setForThisThread(BlockingObserver* observer) { threadObserver_ = observer; }
+    [[nodiscard]] static BlockingObserver* ofThisThread() { return threadObserver_; }
+
+private:
+    static inline thread_local BlockingObserver* threadObserver_ = nullptr;
+};
+
+class BlockingScope {
+public:
+    BlockingScope() : observer_(BlockingObserver::ofThisThread()) {
+        if (observer_)
+            observer_->willBlock();
+    }
+    ~BlockingScope() {
+        if (observer_)
+            observer_->didBlock();
+    }
+    BlockingScope(const BlockingScope&) = delete;
+    BlockingScope& operator=(const BlockingScope&) = delete;
+
+private:
+    BlockingObserver* observer_;
 };
 
 } // namespace zor::platform

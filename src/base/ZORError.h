@@ -6,9 +6,8 @@
 // says. A code, once given out, keeps its meaning: clients get it as "ReplyError".
 #pragma once
 
-#include "base/ErrorCode.h"
 #include "base/Log.h"
-#include "base/Try.h"
+#include "ipc/Protocol.h"
 #include "platform/Device.h"
 #include "platform/Errno.h"
 

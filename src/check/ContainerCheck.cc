@@ -4,14 +4,14 @@
 
 #include "base/ContainerClass.h"
 #include "check/Finding.h"
-#include "fs/AtomicFile.h"
-#include "fs/ItemStatus.h"
+#include "fs/Durability.h"
+#include "fs/MountFences.h"
 #include "fs/Names.h"
 #include "ipc/Protocol.h"
 #include "os/FileDescriptor.h"
 #include "os/SystemRoot.h"
-#include "store/Names.h"
-#include "store/ZORGlobalConfiguration.h"
+#include "store/Configuration.h"
+#include "store/StorePlaces.h"
 
 #include <algorithm>
 #include <cerrno>

@@ -1,11 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "check/StoreCheck.h"
 
-#include "base/Try.h"
 #include "check/Checks.h"
-#include "check/Look.h"
 #include "identity/Users.h"
 #include "os/SystemRoot.h"
+#include "platform/Errno.h"
 #include "store/StorePlaces.h"
 
 #include <algorithm>

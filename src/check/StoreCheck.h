@@ -9,9 +9,8 @@
 
 #include "base/Log.h"
 #include "check/Finding.h"
+#include "device/DataProtection.h"
 #include "device/DeviceQueries.h"
-#include "device/FileDeviceLockState.h"
-#include "device/XattrProtectionClass.h"
 #include "fs/ZORFileManager.h"
 #include "identity/Users.h"
 #include "ipc/UserNumbers.h"

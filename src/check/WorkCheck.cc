@@ -2,11 +2,11 @@
 // The daemon's own directories and marks.
 #include "check/Checks.h"
 
-#include "base/Format.h"
 #include "device/LinkSandboxUserState.h"
-#include "fs/AtomicFile.h"
+#include "fs/Durability.h"
 #include "fs/Names.h"
 #include "fs/Trees.h"
+#include "ipc/Identifiers.h"
 #include "os/FileDescriptor.h"
 #include "os/SystemRoot.h"
 #include "store/ReplaceJournal.h"
@@ -197,7 +197,7 @@ void WorkCheck::checkMappings() {
                 continue;
             Finding& finding = look_.add(FindingCode::mappingDangling, url.appendingFile(name),
                                          "is a sandbox mapping that leads to no container", Mender::launch);
-            finding.identifier = platform::percentDecode(name).value_or("");
+            finding.identifier = ipc::percentDecode(name).value_or("");
             finding.user = user;
         }
     });

@@ -18,8 +18,8 @@
 #include "fs/ZORFileManager.h"
 #include "os/RunLoop.h"
 #include "platform/Platform.h"
+#include "store/Configuration.h"
 #include "store/ZORContainerCache.h"
-#include "store/ZORGlobalConfiguration.h"
 #include "store/ZORWhitelist.h"
 #include "upcall/UpcallServer.h"
 

@@ -2,6 +2,7 @@
 #include "daemon/Dispatcher.h"
 
 #include "base/Log.h"
+#include "daemon/commands/Commands.h"
 #include "ipc/Identifiers.h"
 #include "platform/Service.h"
 
@@ -10,6 +11,52 @@
 namespace zor {
 
 namespace powers = platform::entitlementKeys;
+
+namespace {
+
+using ipc::Command;
+
+constexpr std::string_view none = noEntitlementRequired;
+constexpr ReplyFlag now = ReplyFlag::dispatcherReplies;
+constexpr ReplyFlag later = ReplyFlag::handlerReplies;
+
+constexpr std::array<ZORCommandTableRow, ipc::commandCount> rows = {{
+    {Command::createOrLookupContainer, commands::createOrLookupContainer, none, now},
+    {Command::listContainers, commands::listContainers, powers::allowed, now},
+    {Command::replaceContainer, commands::replaceContainer, powers::allowed, now},
+    {Command::stageContainersForDelete, commands::stageContainersForDelete, powers::allowed, now},
+    {Command::deleteContainersOnDeathRow, commands::deleteContainersOnDeathRow, powers::allowed, later},
+    {Command::setInfoValue, commands::setInfoValue, powers::allowed, now},
+    {Command::getInfoValue, commands::getInfoValue, powers::allowed, now},
+    {Command::getMetadata, commands::getMetadata, powers::allowed, now},
+    {Command::recreateDefaultStructure, commands::recreateDefaultStructure, powers::allowed, now},
+    {Command::regenerateDirectoryUUID, commands::regenerateDirectoryUUID, powers::allowed, now},
+    {Command::deleteContainer, commands::deleteContainer, powers::allowed, now},
+    {Command::wipeEntitledPluginDataContainer, commands::wipeEntitledPluginDataContainer, powers::wipeContainer, now},
+    {Command::wipeDataContainerContent, commands::wipeDataContainerContent, powers::allowed, now},
+    {Command::getGroupContainerPaths, commands::getGroupContainerPaths, none, now},
+    {Command::getGroupContainerIdentifiers, commands::getGroupContainerIdentifiers, powers::allowed, now},
+    {Command::getSystemContainerPath, commands::getSystemContainerPath, none, now},
+    {Command::getSystemGroupContainerPaths, commands::getSystemGroupContainerPaths, none, now},
+    {Command::getSystemGroupContainerPath, commands::getSystemGroupContainerPath, none, now},
+    {Command::processEntitlements, commands::processEntitlements, powers::allowed, now},
+    {Command::setDataProtection, commands::setDataProtection, powers::allowed, later},
+    {Command::recreateDefaultStructure2, commands::recreateDefaultStructure, powers::allowed, now},
+    {Command::getDiskUsage, commands::getDiskUsage, powers::allowed, now},
+    {Command::retryTest, commands::retryTest, powers::allowed, now},
+}};
+
+constexpr bool everyRowIsItsCommand() {
+    for (std::size_t i = 0; i < rows.size(); ++i)
+        if (static_cast<std::size_t>(rows[i].command) != i || rows[i].handler == nullptr)
+            return false;
+    return true;
+}
+static_assert(everyRowIsItsCommand());
+
+} // namespace
+
+const std::array<ZORCommandTableRow, ipc::commandCount> commandTable = rows;
 
 namespace {
 

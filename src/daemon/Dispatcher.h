@@ -1,21 +1,48 @@
 // SPDX-License-Identifier: Apache-2.0
-// The way of every message: is the command one, who sends it, may it be sent, then the handler and the reply.
+// The table of the commands, and the way of every message: is the command one, who sends it, may it be sent, then the
+// handler and the reply.
 //
 // A message that is refused ends its connection without a reply. The dispatcher holds no lock and keeps nothing of a
 // peer between messages. Messages of one connection come one at a time, those of different ones in parallel.
 #pragma once
 
 #include "base/ContainerClass.h"
-#include "daemon/CommandTable.h"
 #include "daemon/Operations.h"
+#include "daemon/ZORClientConnection.h"
+#include "ipc/Protocol.h"
 #include "platform/Service.h"
 
+#include <array>
 #include <atomic>
 #include <cstdint>
 #include <memory>
 #include <optional>
+#include <string_view>
 
 namespace zor {
+
+// The commands that a client may send: which entitlement each needs, who handles it, and who sends the reply.
+
+struct CommandContext;
+using ZORCommandHandler = void (*)(CommandContext&);
+
+/// Stands for "no entitlement needed": the peer must have an entitlement dictionary all the same.
+inline constexpr std::string_view noEntitlementRequired = "com.veltra.private.Zorvane.none";
+
+enum class ReplyFlag : std::int32_t {
+    handlerReplies = 0,
+    dispatcherReplies = 1,
+};
+
+struct ZORCommandTableRow {
+    ipc::Command command;
+    ZORCommandHandler handler;
+    std::string_view requiredEntitlement;
+    ReplyFlag replyFlag;
+};
+
+/// Row i describes command i.
+extern const std::array<ZORCommandTableRow, ipc::commandCount> commandTable;
 
 class Dispatcher {
 public:

@@ -1,10 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "daemon/LinuxPlatform.h"
 
-#include "base/Try.h"
-#include "fs/AtomicFile.h"
+#include "fs/Durability.h"
 #include "identity/Users.h"
 #include "os/SystemRoot.h"
+#include "platform/Errno.h"
 
 #include <algorithm>
 #include <cerrno>

@@ -5,12 +5,11 @@
 // The order of the members is the order in which they come into being; they go the other way round.
 #pragma once
 
+#include "device/DataProtection.h"
 #include "device/DeviceQueries.h"
 #include "device/FileCrashAnnotation.h"
-#include "device/FileDeviceLockState.h"
 #include "device/FileTerminationAssertionService.h"
 #include "device/LinkSandboxUserState.h"
-#include "device/XattrProtectionClass.h"
 #include "identity/IdentityRegistry.h"
 #include "identity/LinuxPeer.h"
 #include "identity/Users.h"

@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "device/FileCrashAnnotation.h"
 
-#include "base/Try.h"
 #include "os/FileDescriptor.h"
 #include "os/SystemRoot.h"
+#include "platform/Errno.h"
 
 #include <cerrno>
 #include <fcntl.h>

@@ -1,10 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "device/FileTerminationAssertionService.h"
 
-#include "base/Format.h"
-#include "base/Try.h"
+#include "ipc/Identifiers.h"
 #include "os/FileDescriptor.h"
 #include "os/SystemRoot.h"
+#include "platform/Errno.h"
 
 #include <cerrno>
 #include <chrono>
@@ -57,8 +57,8 @@ private:
 std::unique_ptr<TerminationAssertionService::Assertion>
 FileTerminationAssertionService::acquire(std::string_view bundleIdentifier, TerminationReason reason,
                                          AcquisitionHandler handler) {
-    const std::string name = percentEncode(bundleIdentifier);
-    if (name.empty() || name.size() > componentBytesMax)
+    const std::string name = ipc::percentEncode(bundleIdentifier);
+    if (name.empty() || name.size() > ipc::componentBytesMax)
         return nullptr;
     std::string identifier(bundleIdentifier);
     const Errno failure = hold(identifier, reason);
@@ -96,7 +96,7 @@ ErrnoOr<FileDescriptor> FileTerminationAssertionService::openDirectory() {
 
 ErrnoOr<FileDescriptor> FileTerminationAssertionService::lockFile(const std::string& identifier,
                                                                   TerminationReason reason) {
-    const std::string name = percentEncode(identifier);
+    const std::string name = ipc::percentEncode(identifier);
     const FileDescriptor directory = TRY(openDirectory());
     // A file that an earlier daemon left may be open in a launcher that waits on it; a new file cannot be.
     const Errno removed = disk_.unlinkFile(directory.get(), name.c_str());
@@ -122,7 +122,7 @@ void FileTerminationAssertionService::release(const std::string& identifier) {
         return;
     // The name goes before the lock: who gets the lock of a file without a name looks again.
     if (const auto directory = openDirectory())
-        (void)disk_.unlinkFile(directory->get(), percentEncode(identifier).c_str());
+        (void)disk_.unlinkFile(directory->get(), ipc::percentEncode(identifier).c_str());
     held_.erase(found);
 }
 

@@ -1,10 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "device/LinkSandboxUserState.h"
 
-#include "base/Format.h"
-#include "base/Try.h"
+#include "ipc/Identifiers.h"
 #include "os/FileDescriptor.h"
 #include "os/SystemRoot.h"
+#include "platform/Errno.h"
 
 #include <cerrno>
 #include <charconv>
@@ -85,10 +85,10 @@ ErrnoOr<FileDescriptor> LinkSandboxUserState::directoryOf(std::uint32_t userId, 
 
 Errno LinkSandboxUserState::setMapping(std::uint32_t userId, SandboxItemType type, std::string_view identifier,
                                        const std::optional<std::string>& path) {
-    const std::string name = percentEncode(identifier);
+    const std::string name = ipc::percentEncode(identifier);
     if (name.empty())
         return Errno(EINVAL);
-    if (name.size() > componentBytesMax)
+    if (name.size() > ipc::componentBytesMax)
         return Errno(ENAMETOOLONG);
     const auto directory = directoryOf(userId, type, path ? Missing::make : Missing::fail);
     if (!path) {

@@ -2,7 +2,7 @@
 // One item copied, out of a copy of a tree.
 #include "fs/Trees.h"
 
-#include "base/Try.h"
+#include "platform/Errno.h"
 
 #include <algorithm>
 #include <array>

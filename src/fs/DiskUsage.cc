@@ -4,7 +4,7 @@
 
 #include "base/Log.h"
 #include "base/ZORError.h"
-#include "fs/ItemStatus.h"
+#include "fs/MountFences.h"
 #include "fs/SharedWork.h"
 #include "fs/TreeWalker.h"
 #include "os/FileDescriptor.h"

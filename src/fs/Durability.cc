@@ -1,15 +1,204 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/Durability.h"
 
-#include "base/Try.h"
+#include "os/FileDescriptor.h"
+#include "platform/Errno.h"
+#include "plist/Codec.h"
 
+#include <cerrno>
 #include <cstdio>
+#include <cstring>
+#include <fcntl.h>
 #include <string>
 #include <string_view>
+#include <sys/random.h>
 #include <sys/stat.h>
 #include <sys/statfs.h>
 #include <sys/sysmacros.h>
 #include <unistd.h>
+
+namespace zor::fs {
+
+using platform::FileDescriptor;
+
+namespace {
+
+constexpr std::size_t randomCharacters = 6;
+constexpr int namesTriedMax = 16;
+constexpr mode_t permissionBits = 07777;
+
+constexpr std::string_view temporaryMark = ".new-";
+/// The one name that a target's writes use, so that the next one finds what a stop left of the last: looking for it
+/// would be a walk of a directory that its owner may have filled.
+constexpr std::string_view usualSuffix = "000000";
+static_assert(usualSuffix.size() == randomCharacters);
+
+} // namespace
+
+bool isWriteLeftover(std::string_view name) {
+    const std::size_t suffix = temporaryMark.size() + randomCharacters;
+    return name.starts_with('.') && name.size() > suffix &&
+           name.substr(name.size() - suffix).starts_with(temporaryMark);
+}
+
+std::string uniqueName(std::string prefix) {
+    static constexpr char alphabet[] = "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789_-";
+    static_assert(sizeof alphabet - 1 == 64);
+    std::uint8_t random[randomCharacters] = {};
+    // Uniqueness comes from O_EXCL and mkdir; without entropy the callers' retries end with EEXIST.
+    if (::getrandom(random, sizeof random, GRND_NONBLOCK) < 0)
+        random[0] = 0;
+    for (const std::uint8_t byte : random)
+        prefix += alphabet[byte & 63];
+    return prefix;
+}
+
+ErrnoOr<FileDescriptor> writeNewFile(platform::Disk& disk, int directory, const char* name, mode_t mode,
+                                     std::span<const std::uint8_t> bytes) {
+    FileDescriptor file = TRY(disk.createFile(directory, name, mode));
+    // The process's umask, or what the directory hands down, may have changed it.
+    struct stat made{};
+    if (::fstat(file.get(), &made) != 0)
+        return Errno::last();
+    if ((made.st_mode & permissionBits) != mode)
+        TRY(disk.changeMode(file.get(), mode));
+    TRY(disk.write(file.get(), bytes));
+    return file;
+}
+
+Errno replaceFileDurably(platform::Disk& disk, int directory, const std::string& name, mode_t mode,
+                         std::span<const std::uint8_t> bytes, const std::function<Errno(int file)>& prepare) {
+    ZOR_ASSERT(!name.empty() && name.find('/') == std::string::npos);
+    const std::string prefix = "." + name + std::string(temporaryMark);
+    std::string temporary = prefix + std::string(usualSuffix);
+    const auto write = [&] { return writeNewFile(disk, directory, temporary.c_str(), mode, bytes); };
+    auto file = write();
+    const auto isTaken = [&] { return !file && file.error() == EEXIST; };
+    if (isTaken() && !disk.unlinkFile(directory, temporary.c_str()))
+        file = write();
+    // The directory's owner holds that name.
+    for (int tried = 0; isTaken() && tried < namesTriedMax; ++tried) {
+        temporary = uniqueName(prefix);
+        file = write();
+    }
+    Errno error = file ? Errno() : file.error();
+    if (!error && prepare)
+        error = prepare(file->get());
+    if (!error)
+        error = disk.sync(file->get());
+    if (!error)
+        error = disk.rename(directory, temporary.c_str(), directory, name.c_str(), 0);
+    if (error) {
+        if (!isTaken())
+            (void)disk.unlinkFile(directory, temporary.c_str());
+        return error;
+    }
+    // The directory descriptor may be O_PATH, which cannot be synced.
+    return disk.sync(TRY(platform::openBeneath(directory, ".", O_RDONLY | O_DIRECTORY)).get());
+}
+
+namespace {
+
+/// EPERM for a file that somebody else may have written.
+Errno judge(const struct stat& status, std::size_t bytesMax, std::optional<uid_t> formerOwner) {
+    const bool trustedOwner = status.st_uid == 0 || status.st_uid == ::geteuid() || status.st_uid == formerOwner;
+    if (!S_ISREG(status.st_mode) || status.st_nlink != 1 || !trustedOwner || (status.st_mode & (S_IWGRP | S_IWOTH)))
+        return Errno(EPERM);
+    return static_cast<std::size_t>(status.st_size) > bytesMax ? Errno(EFBIG) : Errno();
+}
+
+} // namespace
+
+ErrnoOr<plist::Data> readOwnedFile(platform::Disk& disk, int directory, const char* path, std::size_t bytesMax,
+                                   std::optional<uid_t> formerOwner) {
+    const FileDescriptor file =
+        TRY(platform::openBeneathOnMount(directory, path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY));
+    struct stat status{};
+    if (::fstat(file.get(), &status) != 0)
+        return Errno::last();
+    TRY(judge(status, bytesMax, formerOwner));
+    // One that grows meanwhile is read to its old size.
+    plist::Data bytes(static_cast<std::size_t>(status.st_size));
+    std::size_t length = 0;
+    while (length < bytes.size()) {
+        const std::size_t count = TRY(disk.read(file.get(), std::span(bytes).subspan(length)));
+        if (count == 0)
+            break;
+        length += count;
+    }
+    bytes.resize(length);
+    return bytes;
+}
+
+} // namespace zor::fs
+
+namespace zor {
+
+Result<plist::Data> serialisedFor(const FileURL& url, const plist::Dictionary& dictionary, std::size_t bytesMax) {
+    plist::Data bytes;
+    if (const auto done = plist::appendBinary(dictionary, bytes); !done)
+        return posixError(ZOR_HERE, Errno(EINVAL), "serialisation for %s failed: %s", url.c_str(), done.error().reason);
+    if (bytes.size() > bytesMax)
+        return posixError(ZOR_HERE, Errno(EFBIG),
+                          "write of %s failed: %zu bytes are more than the %zu that it may have", url.c_str(),
+                          bytes.size(), bytesMax);
+    return bytes;
+}
+
+Result<void> writeToURL(const plist::Dictionary& dictionary, const FileURL& url, std::uint32_t options,
+                        std::size_t bytesMax, ZORFileManager& fileManager) {
+    if (options != (writeAtomically | writeWithoutProtection))
+        return posixError(ZOR_HERE, Errno(EINVAL), "write of %s failed: options 0x%x are not offered", url.c_str(),
+                          options);
+    const plist::Data bytes = TRY(serialisedFor(url, dictionary, bytesMax));
+    const auto parent = fileManager.resolver().openParent(url);
+    const Errno error =
+        parent ? fs::replaceFileDurably(
+                     fileManager.disk(), parent->directory.get(), parent->name, 0644, bytes,
+                     [&](int file) { return fileManager.setClassAtCreation(file, classWithoutProtection); })
+               : parent.error();
+    if (error)
+        return posixError(ZOR_HERE, error, "write of %s failed: %s", url.c_str(), error.text());
+    return {};
+}
+
+Result<plist::Dictionary> readDictionaryAtURL(const FileURL& url, std::size_t bytesMax, ZORFileManager& fileManager) {
+    const auto parent = fileManager.resolver().openParent(url);
+    const auto bytes =
+        parent ? fs::readOwnedFile(fileManager.disk(), parent->directory.get(), parent->name.c_str(), bytesMax)
+               : parent.error();
+    if (!bytes)
+        return posixError(ZOR_HERE, bytes.error(), "read of %s failed: %s", url.c_str(), bytes.error().text());
+    auto value = plist::readPropertyList(*bytes);
+    if (!value)
+        return posixError(ZOR_HERE, Errno(EINVAL), "read of %s failed: %s", url.c_str(), value.error().text().c_str());
+    plist::Dictionary* dictionary = value->asMutableDictionary();
+    if (!dictionary)
+        return posixError(ZOR_HERE, Errno(EINVAL), "read of %s failed: it is no dictionary", url.c_str());
+    return std::move(*dictionary);
+}
+
+std::string stringWithFileSystemRepresentation(const char* bytes, std::size_t length) {
+    return {bytes, length};
+}
+
+std::string stringWithFileSystemRepresentation(const char* bytes) {
+    return {bytes, std::strlen(bytes)};
+}
+
+bool containsDotDotPathComponents(std::string_view path) {
+    while (!path.empty()) {
+        const auto slash = path.find('/');
+        if (path.substr(0, slash) == "..")
+            return true;
+        if (slash == std::string_view::npos)
+            break;
+        path.remove_prefix(slash + 1);
+    }
+    return false;
+}
+
+} // namespace zor
 
 namespace zor::fs {
 

@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/FileSystemDeathRow.h"
 
-#include "base/Try.h"
 #include "fs/Names.h"
 #include "os/FileDescriptor.h"
+#include "platform/Errno.h"
 
 #include <cerrno>
 #include <fcntl.h>

@@ -10,10 +10,69 @@
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/sysmacros.h>
 #include <unistd.h>
 #include <utility>
 
 namespace zor::fs {
+
+namespace {
+
+/// Newer than the headers; a kernel that does not know it says so in the answer's mask.
+constexpr unsigned uniqueMountWanted = 0x4000;
+constexpr int remembered = AT_STATX_DONT_SYNC | AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT;
+
+timespec timeOf(const statx_timestamp& time) {
+    return {.tv_sec = time.tv_sec, .tv_nsec = time.tv_nsec};
+}
+
+struct stat statusIn(const struct statx& found) {
+    struct stat status{};
+    status.st_dev = ::makedev(found.stx_dev_major, found.stx_dev_minor);
+    status.st_ino = found.stx_ino;
+    status.st_mode = found.stx_mode;
+    status.st_nlink = found.stx_nlink;
+    status.st_uid = found.stx_uid;
+    status.st_gid = found.stx_gid;
+    status.st_rdev = ::makedev(found.stx_rdev_major, found.stx_rdev_minor);
+    status.st_size = static_cast<off_t>(found.stx_size);
+    status.st_blksize = static_cast<blksize_t>(found.stx_blksize);
+    status.st_blocks = static_cast<blkcnt_t>(found.stx_blocks);
+    status.st_atim = timeOf(found.stx_atime);
+    status.st_mtim = timeOf(found.stx_mtime);
+    status.st_ctim = timeOf(found.stx_ctime);
+    return status;
+}
+
+} // namespace
+
+Errno statusOfName(int directory, const char* name, struct stat& status) {
+    struct statx found{};
+    if (::statx(directory, name, remembered, STATX_BASIC_STATS, &found) != 0)
+        return Errno::last();
+    status = statusIn(found);
+    // A directory that is open may be the root of a mount itself: "." leads nowhere else.
+    const bool crossed = (found.stx_attributes & STATX_ATTR_MOUNT_ROOT) != 0 && std::strcmp(name, ".") != 0;
+    return crossed ? Errno(EXDEV) : Errno();
+}
+
+Errno statusOfDescriptor(int descriptor, struct stat& status, MountIdentity& mount) {
+    struct statx found{};
+    if (::statx(descriptor, "", AT_EMPTY_PATH | remembered, STATX_BASIC_STATS | STATX_MNT_ID | uniqueMountWanted,
+                &found) != 0)
+        return Errno::last();
+    status = statusIn(found);
+    mount = {.mount = found.stx_mnt_id, .device = status.st_dev};
+    return Errno();
+}
+
+std::uint64_t mountNumber(int descriptor) {
+    struct statx found{};
+    if (::statx(descriptor, "", AT_EMPTY_PATH | remembered, STATX_MNT_ID, &found) != 0)
+        return 0;
+    return found.stx_mnt_id;
+}
 
 using platform::FileDescriptor;
 using platform::MutexLock;

@@ -1,20 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
-// Below which directories users can mount, and how what lies below one is reached without waiting for what they
-// mounted.
-//
-// A fence is a directory: a user's home, or the place of containers that belong to the system. Below it no step of a
-// path crosses a mount, so the file system of a mount point there is never asked. The fence itself may lie on any
-// mount. That of a home is judged whenever it is another than before: a file system that a user serves (FUSE) is no
-// home, EXDEV; one that is not of this machine may stop answering. Such a home is asked on a thread of its own whether
-// it still answers, at most once in `answerHoldsMilliseconds`, and while it does not, all that leads there fails
-// with EHOSTDOWN at once. A caller that is about to take a lock that others need asks anew. Not defended: a home that
-// stops answering between the question and the use holds the thread that is there.
-//
-// Changes nothing on the disk. Any thread; fences are added, never taken away.
+// The status of items and the mounts that they lie on, without waiting for a file system that a user made or that is
+// elsewhere.
 #pragma once
 
 #include "base/Mutex.h"
-#include "fs/ItemStatus.h"
 #include "os/BoundedQuestion.h"
 #include "os/FileDescriptor.h"
 #include "platform/Errno.h"
@@ -27,8 +16,41 @@
 #include <string>
 #include <string_view>
 #include <sys/stat.h>
+#include <sys/types.h>
 
 namespace zor::fs {
+
+// The status of an item, out of what the kernel remembers of it: a file system that is not here, or that a user made,
+// is not asked, and so cannot make anybody wait. Any thread.
+
+/// lstat of one name in an open directory. EXDEV where another file system, or another part of this one,
+/// is mounted on the name; `status` is then that of its root, as far as it is remembered (the type is).
+Errno statusOfName(int directory, const char* name, struct stat& status);
+
+/// Which mount something lies on. Kernels before 6.8 give the number of a mount that is gone to another one, seldom
+/// together with the number of its device.
+struct MountIdentity {
+    std::uint64_t mount = 0;
+    dev_t device = 0;
+    bool operator==(const MountIdentity&) const = default;
+};
+/// fstat of an open descriptor (O_PATH too), and its mount.
+Errno statusOfDescriptor(int descriptor, struct stat& status, MountIdentity& mount);
+/// The number of the mount in /proc/self/mountinfo; 0 when it cannot be had.
+[[nodiscard]] std::uint64_t mountNumber(int descriptor);
+
+// Below which directories users can mount, and how what lies below one is reached without waiting for what they
+// mounted.
+//
+// A fence is a directory: a user's home, or the place of containers that belong to the system. Below it no step of a
+// path crosses a mount, so the file system of a mount point there is never asked. The fence itself may lie on any
+// mount. That of a home is judged whenever it is another than before: a file system that a user serves (FUSE) is no
+// home, EXDEV; one that is not of this machine may stop answering. Such a home is asked on a thread of its own whether
+// it still answers, at most once in `answerHoldsMilliseconds`, and while it does not, all that leads there fails
+// with EHOSTDOWN at once. A caller that is about to take a lock that others need asks anew. Not defended: a home that
+// stops answering between the question and the use holds the thread that is there.
+//
+// Changes nothing on the disk. Any thread; fences are added, never taken away.
 
 using OpenResult = ErrnoOr<platform::FileDescriptor>;
 

@@ -7,7 +7,7 @@
 namespace zor::fs {
 
 // Names that a stop may leave behind. None of them is ever taken for the real thing. The leftover of an atomic write is
-// named in AtomicFile.h.
+// named in Durability.h.
 
 /// How a copy across file systems is named until it is whole.
 inline constexpr const char* copyPrefix = ".zorvaned-copy-";

@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "fs/PathResolver.h"
 
-#include "base/Try.h"
 #include "os/FileDescriptor.h"
+#include "platform/Errno.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -12,15 +12,6 @@
 namespace zor::fs {
 
 using platform::openBeneath;
-
-ErrnoOr<DirectoryId> directoryIdOf(int directory) {
-    struct statx status{};
-    if (::statx(directory, "", AT_EMPTY_PATH | AT_STATX_DONT_SYNC, STATX_INO | STATX_MNT_ID, &status) != 0)
-        return Errno::last();
-    return DirectoryId{.device = makedev(status.stx_dev_major, status.stx_dev_minor),
-                       .inode = status.stx_ino,
-                       .mount = status.stx_mnt_id};
-}
 
 const char* PathResolver::relative(const FileURL& url) const {
     const std::string& root = root_.canonicalPath();

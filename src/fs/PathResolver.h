@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// From a path to a descriptor, without following anything.
+// The names of places, and the way from a name to a descriptor, without following anything.
 //
 // Below a user's home every name can change between two system calls. So a path is resolved once, from the open root,
 // in one openat2 that follows no link and leaves no root; what comes after acts on the descriptor. A path outside the
@@ -7,7 +7,6 @@
 // the way is one too: EXDEV, and EHOSTDOWN where the file system of a home does not answer. Any thread.
 #pragma once
 
-#include "base/FileURL.h"
 #include "fs/MountFences.h"
 #include "os/FileDescriptor.h"
 #include "os/SystemRoot.h"
@@ -15,11 +14,62 @@
 #include "platform/Errno.h"
 
 #include <cstdint>
+#include <fcntl.h>
 #include <functional>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <sys/stat.h>
+#include <sys/sysmacros.h>
+#include <utility>
+
+namespace zor {
+
+/// A place in the file system: an absolute path, and whether it is meant as a directory. Names only; whoever acts on it
+/// resolves it anew and goes on with the descriptor.
+class FileURL {
+public:
+    FileURL() = default;
+    FileURL(std::string path, bool isDirectory) : path_(std::move(path)), isDirectory_(isDirectory) {
+        while (path_.size() > 1 && path_.back() == '/')
+            path_.pop_back();
+    }
+    static FileURL directory(std::string path) { return {std::move(path), true}; }
+    static FileURL file(std::string path) { return {std::move(path), false}; }
+
+    /// Without a trailing slash (but for "/").
+    [[nodiscard]] const std::string& path() const { return path_; }
+    [[nodiscard]] const char* c_str() const { return path_.c_str(); }
+    [[nodiscard]] bool isDirectory() const { return isDirectory_; }
+    [[nodiscard]] bool empty() const { return path_.empty(); }
+
+    [[nodiscard]] FileURL appendingDirectory(std::string_view components) const { return append(components, true); }
+    [[nodiscard]] FileURL appendingFile(std::string_view components) const { return append(components, false); }
+    [[nodiscard]] std::string_view lastPathComponent() const {
+        return std::string_view(path_).substr(path_.rfind('/') + 1);
+    }
+    [[nodiscard]] FileURL deletingLastPathComponent() const {
+        const auto slash = path_.rfind('/');
+        return {slash == 0 || slash == std::string::npos ? "/" : path_.substr(0, slash), true};
+    }
+    bool operator==(const FileURL&) const = default;
+
+private:
+    [[nodiscard]] FileURL append(std::string_view components, bool isDirectory) const {
+        std::string joined;
+        joined.reserve(path_.size() + 1 + components.size());
+        joined += path_;
+        if (joined.empty() || joined.back() != '/')
+            joined += '/';
+        joined += components;
+        return {std::move(joined), isDirectory};
+    }
+
+    std::string path_;
+    bool isDirectory_ = false;
+};
+
+} // namespace zor
 
 namespace zor::fs {
 
@@ -42,7 +92,14 @@ struct DirectoryId {
     bool operator==(const DirectoryId&) const = default;
 };
 /// Asks no server that keeps the file system.
-[[nodiscard]] ErrnoOr<DirectoryId> directoryIdOf(int directory);
+[[nodiscard]] inline ErrnoOr<DirectoryId> directoryIdOf(int directory) {
+    struct statx status{};
+    if (::statx(directory, "", AT_EMPTY_PATH | AT_STATX_DONT_SYNC, STATX_INO | STATX_MNT_ID, &status) != 0)
+        return Errno::last();
+    return DirectoryId{.device = makedev(status.stx_dev_major, status.stx_dev_minor),
+                       .inode = status.stx_ino,
+                       .mount = status.stx_mnt_id};
+}
 
 class PathResolver {
 public:

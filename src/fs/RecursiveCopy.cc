@@ -4,10 +4,9 @@
 // nothing has to be kept in memory. It goes before the root gets its attributes.
 #include "fs/Trees.h"
 
-#include "base/Try.h"
-#include "fs/ItemStatus.h"
 #include "fs/TreeWalker.h"
 #include "os/FileDescriptor.h"
+#include "platform/Errno.h"
 
 #include <array>
 #include <cerrno>

@@ -2,10 +2,10 @@
 // The removal of a tree.
 #include "fs/Trees.h"
 
-#include "base/Try.h"
-#include "fs/ItemStatus.h"
+#include "fs/MountFences.h"
 #include "fs/TreeWalker.h"
 #include "os/FileDescriptor.h"
+#include "platform/Errno.h"
 
 #include <algorithm>
 #include <cerrno>

@@ -1,21 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
-// Visits every item of a tree, the root first, without following links and without leaving the root's file system.
-//
-// The trees belong to others, who change them while they are walked. So every step starts from a directory that is
-// open; a name that is gone when its turn comes counts as never having been there; a name that became something else is
-// visited as what it is now. A directory is visited before and after its content. A mount point, or a subvolume, is
-// visited before and after but not entered, and nothing of what lies on it is asked; that holds for the root of the
-// walk too, unless it is ".". A mount on a file is shown as the file where only types are wanted.
-//
-// Any depth and any width: fewer than DirectoryStack::openMax + 8 descriptors, no recursion, and memory that grows with
-// the length of the current path alone. A directory whose descriptor had to be closed is found again by ".." and must
-// be the same inode as before; else by its names from the root, each of them checked; else it counts as vanished, with
-// what was not yet visited in it.
-//
-// The visitor may remove, rename and change items. One walk at a time for an object, in one thread.
+// Walking over what a directory holds: the entries of one, and every item of a tree. The trees belong to others, who
+// change them meanwhile.
 #pragma once
 
-#include "fs/ItemStatus.h"
 #include "os/FileDescriptor.h"
 #include "platform/Errno.h"
 
@@ -25,6 +12,7 @@
 #include <functional>
 #include <memory>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 #include <sys/stat.h>
@@ -33,6 +21,56 @@
 #include <vector>
 
 namespace zor::fs {
+
+// The entries of an open directory, as many at a time as fit a caller's buffer (getdents64).
+//
+// "." and ".." are left out. A directory that was removed meanwhile has no entries; that is no error. Entries that
+// others add or remove while it is read may be seen or not; every other entry is seen exactly once. The descriptor and
+// the buffer belong to the caller and have to outlive the reader. One thread at a time.
+
+class BulkDirectoryRead {
+public:
+    static constexpr std::size_t bufferBytes = 32768;
+    using Buffer = std::array<std::byte, bufferBytes>;
+
+    struct Entry {
+        /// NUL-terminated, one component; valid until the call of next() after the one that gave it.
+        const char* name = nullptr;
+        std::size_t nameBytes = 0;
+        ino_t inode = 0;
+        /// A DT_ value of <dirent.h>; DT_UNKNOWN where the file system does not say.
+        unsigned char type = 0;
+    };
+
+    /// Reads on from the descriptor's offset. The buffer holds at least one entry of any name: 512 bytes or more.
+    BulkDirectoryRead(int directory, std::span<std::byte> buffer);
+
+    /// The next entry, or nullptr at the end and after an error.
+    const Entry* next();
+    /// The error of the read that ended the entries.
+    [[nodiscard]] Errno error() const { return error_; }
+    /// The place at which the entry after the last one given begins. Good for seek(), on this or another descriptor of
+    /// the same directory.
+    [[nodiscard]] off_t position() const { return position_; }
+    /// Goes on at a position; 0 is the beginning.
+    Errno seek(off_t position);
+
+private:
+    bool fill();
+
+    int directory_;
+    std::span<std::byte> buffer_;
+    std::size_t filled_ = 0;
+    std::size_t used_ = 0;
+    off_t position_ = 0;
+    Errno error_;
+    Entry entry_;
+};
+
+// A directory that was made where others may write: they can put another in its place before it is opened.
+
+/// Whether the open directory can be the one that this process just made: its own, closed to others, and empty.
+[[nodiscard]] bool isFreshDirectory(int directory);
 
 // The directories from the root of a walk down to where it is, with a bounded number of them open.
 //
@@ -116,6 +154,21 @@ private:
     /// The root's, and one for each level modulo openMax.
     std::array<Slot, openMax + 1> slots_;
 };
+
+// Visits every item of a tree, the root first, without following links and without leaving the root's file system.
+//
+// The trees belong to others, who change them while they are walked. So every step starts from a directory that is
+// open; a name that is gone when its turn comes counts as never having been there; a name that became something else is
+// visited as what it is now. A directory is visited before and after its content. A mount point, or a subvolume, is
+// visited before and after but not entered, and nothing of what lies on it is asked; that holds for the root of the
+// walk too, unless it is ".". A mount on a file is shown as the file where only types are wanted.
+//
+// Any depth and any width: fewer than DirectoryStack::openMax + 8 descriptors, no recursion, and memory that grows with
+// the length of the current path alone. A directory whose descriptor had to be closed is found again by ".." and must
+// be the same inode as before; else by its names from the root, each of them checked; else it counts as vanished, with
+// what was not yet visited in it.
+//
+// The visitor may remove, rename and change items. One walk at a time for an object, in one thread.
 
 enum class WalkEntryKind {
     directory,           ///< before its content

@@ -1,10 +1,11 @@
 // SPDX-License-Identifier: Apache-2.0
-// Creating directories, asking what exists, and protection classes.
+// Creating directories, asking what exists, renaming, and protection classes.
 #include "fs/ZORFileManager.h"
 
-#include "fs/AtomicFile.h"
-#include "fs/ItemStatus.h"
+#include "fs/Durability.h"
+#include "fs/MountFences.h"
 #include "fs/PathResolver.h"
+#include "fs/TreeWalker.h"
 #include "os/FileDescriptor.h"
 
 #include <cerrno>
@@ -301,6 +302,27 @@ bool ZORFileManager::itemDoesNotExistBelow(int directory, const char* relativePa
     if (failure && failure != ENOENT)
         log_.write(logLevelError, __func__, "Failed to determine if %s exists: %s", url.c_str(), failure.text());
     return failure == ENOENT;
+}
+
+Result<ZORFileManager::Moved> ZORFileManager::moveItem(int fromDirectory, const FileURL& source, int toDirectory,
+                                                       const FileURL& destination, const GoOn& goOn) {
+    auto renamed = renameItem(fromDirectory, source, toDirectory, destination);
+    if (renamed)
+        return Moved::byName;
+    if (!renamed.error().isPosix(EXDEV))
+        return std::move(renamed).error();
+    TRY(moveAcrossFileSystems(fromDirectory, source, toDirectory, destination, goOn));
+    return Moved::byCopy;
+}
+
+Result<void> ZORFileManager::renameItem(int fromDirectory, const FileURL& source, int toDirectory,
+                                        const FileURL& destination) {
+    const Errno status = disk_.rename(fromDirectory, std::string(source.lastPathComponent()).c_str(), toDirectory,
+                                      std::string(destination.lastPathComponent()).c_str(), 0);
+    if (!status)
+        return {};
+    return posixError({"moveItem", __LINE__}, status, "rename of %s to %s failed: %s", source.c_str(),
+                      destination.c_str(), status.text());
 }
 
 Result<int> ZORFileManager::dataProtectionClassOfItemAtURL(const FileURL& url) {

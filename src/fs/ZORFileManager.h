@@ -11,7 +11,6 @@
 // thing.
 #pragma once
 
-#include "base/FileURL.h"
 #include "base/Mutex.h"
 #include "base/ZORError.h"
 #include "fs/PathResolver.h"

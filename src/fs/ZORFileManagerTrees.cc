@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // The file manager's work on whole trees: removing, copying, moving, walking, listing, measuring.
-#include "fs/AtomicFile.h"
-#include "fs/ItemStatus.h"
+#include "fs/Durability.h"
+#include "fs/MountFences.h"
 #include "fs/Names.h"
 #include "fs/PathResolver.h"
 #include "fs/TreeWalker.h"
@@ -170,27 +170,6 @@ Result<void> ZORFileManager::_moveItemAtURL(const FileURL& source, const FileURL
                           destination.c_str(), (from ? to.error() : from.error()).text());
     TRY(moveItem(from->directory.get(), source, to->directory.get(), destination, goOn));
     return {};
-}
-
-Result<ZORFileManager::Moved> ZORFileManager::moveItem(int fromDirectory, const FileURL& source, int toDirectory,
-                                                       const FileURL& destination, const GoOn& goOn) {
-    auto renamed = renameItem(fromDirectory, source, toDirectory, destination);
-    if (renamed)
-        return Moved::byName;
-    if (!renamed.error().isPosix(EXDEV))
-        return std::move(renamed).error();
-    TRY(moveAcrossFileSystems(fromDirectory, source, toDirectory, destination, goOn));
-    return Moved::byCopy;
-}
-
-Result<void> ZORFileManager::renameItem(int fromDirectory, const FileURL& source, int toDirectory,
-                                        const FileURL& destination) {
-    const Errno status = disk_.rename(fromDirectory, std::string(source.lastPathComponent()).c_str(), toDirectory,
-                                      std::string(destination.lastPathComponent()).c_str(), 0);
-    if (!status)
-        return {};
-    return posixError({"moveItem", __LINE__}, status, "rename of %s to %s failed: %s", source.c_str(),
-                      destination.c_str(), status.text());
 }
 
 Result<void> ZORFileManager::moveAcrossFileSystems(int fromDirectory, const FileURL& source, int toDirectory,

@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "identity/IdentityRegistry.h"
 
-#include "base/Format.h"
-#include "os/CoarseClock.h"
+#include "base/Log.h"
+#include "os/FileChanges.h"
 #include "os/RunLoop.h"
 #include "os/SystemRoot.h"
 #include "plist/Value.h"

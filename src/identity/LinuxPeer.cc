@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "identity/LinuxPeer.h"
 
-#include "base/Try.h"
-#include "os/CoarseClock.h"
+#include "os/FileChanges.h"
 #include "os/FileDescriptor.h"
+#include "platform/Errno.h"
 
 #include <algorithm>
 #include <cerrno>

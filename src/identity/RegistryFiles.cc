@@ -1,10 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "identity/RegistryFiles.h"
 
-#include "base/Try.h"
 #include "ipc/Identifiers.h"
 #include "os/FileDescriptor.h"
 #include "os/SystemRoot.h"
+#include "platform/Errno.h"
 #include "platform/Service.h"
 #include "plist/Codec.h"
 

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "identity/RegistryReport.h"
 
-#include "base/Format.h"
+#include "base/Log.h"
 #include "identity/IdentityRegistry.h"
 #include "os/FileDescriptor.h"
 #include "os/SystemRoot.h"

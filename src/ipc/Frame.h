@@ -34,15 +34,44 @@ struct FrameHeader {
 
     [[nodiscard]] bool expectsReply() const { return (flags & frameExpectsReply) != 0; }
     /// A header that a daemon may read: a length from 1 to requestPayloadBytesMax, and no flag but frameExpectsReply.
-    [[nodiscard]] bool isValidRequest() const;
+    [[nodiscard]] bool isValidRequest() const {
+        return payloadBytes >= 1 && payloadBytes <= requestPayloadBytesMax && (flags & ~frameExpectsReply) == 0;
+    }
     /// A header that a client may read: a length of at least 1, and exactly the flag frameIsReply.
-    [[nodiscard]] bool isValidReply() const;
+    [[nodiscard]] bool isValidReply() const { return payloadBytes >= 1 && flags == frameIsReply; }
 
     bool operator==(const FrameHeader&) const = default;
 };
 
+namespace detail {
+
+template <typename Integer>
+Integer readLittleEndian(const std::uint8_t* bytes) {
+    Integer value = 0;
+    for (std::size_t i = 0; i < sizeof(Integer); ++i)
+        value |= static_cast<Integer>(bytes[i]) << (8 * i);
+    return value;
+}
+
+template <typename Integer>
+void writeLittleEndian(Integer value, std::uint8_t* bytes) {
+    for (std::size_t i = 0; i < sizeof(Integer); ++i)
+        bytes[i] = static_cast<std::uint8_t>(value >> (8 * i));
+}
+
+} // namespace detail
+
 /// Any 16 bytes decode; whether they make sense is the caller's next question.
-FrameHeader decodeFrameHeader(std::span<const std::uint8_t, frameHeaderBytes> bytes);
-void encodeFrameHeader(const FrameHeader& header, std::span<std::uint8_t, frameHeaderBytes> bytes);
+inline FrameHeader decodeFrameHeader(std::span<const std::uint8_t, frameHeaderBytes> bytes) {
+    return {.payloadBytes = detail::readLittleEndian<std::uint32_t>(bytes.data()),
+            .flags = detail::readLittleEndian<std::uint32_t>(bytes.data() + 4),
+            .id = detail::readLittleEndian<std::uint64_t>(bytes.data() + 8)};
+}
+
+inline void encodeFrameHeader(const FrameHeader& header, std::span<std::uint8_t, frameHeaderBytes> bytes) {
+    detail::writeLittleEndian(header.payloadBytes, bytes.data());
+    detail::writeLittleEndian(header.flags, bytes.data() + 4);
+    detail::writeLittleEndian(header.id, bytes.data() + 8);
+}
 
 } // namespace zor::ipc

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// The two names of a container: its identifier, and its UUID.
+// The two names of a container: its identifier, and its UUID; and the name of a file that stands for an identifier.
 //
 // A UUID is data of exactly 16 bytes in a message, 36 characters in the names of directories and locks. It is a value
 // of one thread; the functions are pure, but for random.
@@ -58,3 +58,21 @@ private:
 };
 
 } // namespace zor
+
+namespace zor::ipc {
+
+// Any string as one path component, and back: for names that a client chose and a directory has to hold. Pure; any
+// thread.
+
+/// The longest name a directory can hold. An encoded string that is longer has no file.
+inline constexpr std::size_t componentBytesMax = 255;
+
+/// Letters, digits, "-", "_" and "." stay; every other byte, and a "." in the first place, becomes "%" and two
+/// upper-case hexadecimal digits. Different strings give different names, none of them hidden, none with a slash. An
+/// empty string stays empty, which is no name.
+[[nodiscard]] std::string percentEncode(std::string_view text);
+
+/// The string that percentEncode turned into `component`; nothing when it made no such name.
+[[nodiscard]] std::optional<std::string> percentDecode(std::string_view component);
+
+} // namespace zor::ipc

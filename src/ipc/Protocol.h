@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // The words of the protocol, in their one home: where clients find the daemon, the kinds of container, the numbers of
-// commands, and the keys of requests and replies. The daemon's handlers and the client library both take them from
-// here.
+// commands, the keys of requests and replies, and the codes of errors. The daemon's handlers and the client library
+// both take them from here.
 #pragma once
 
 #include <array>
@@ -203,3 +203,52 @@ inline constexpr std::string_view groupContainerIds = "com.veltra.Brevance.Group
 } // namespace infoKeys
 
 } // namespace zor::ipc
+
+namespace zor {
+
+// The codes of ZORErrorDomain, as "ReplyError" carries them to clients. A code, once given out, keeps its meaning.
+
+enum class ErrorCode : std::uint64_t {
+    success = 1,
+    moveToTemporaryFailed = 4,
+    transientRemovalFailed = 5,
+    subdirectoryFailed = 6,
+    stagingDirectoryFailed = 7,
+    moveToLiveFailed = 8,
+    stagingRemovalFailed = 9,
+    pathNotAsExpected = 10,
+    invalidObject = 11,
+    metadataUnreadable = 12,
+    oldNotMovedToStaging = 14,
+    newNotMovedIntoPlace = 15,
+    deathRowItemNotDestroyed = 17,
+    identifierMissing = 18,
+    notFound = 21,
+    replacedByItself = 22,
+    classesDiffer = 23,
+    infoKeyNotFound = 24,
+    alreadyExists = 27,
+    listForDeletionFailed = 28,
+    metadataInvalid = 29,
+    journalValuesInvalid = 33,
+    propertyListNotWritten = 34,
+    journalUnusable = 35,
+    replaceCleanUpFailed = 36,
+    valueNotAllowed = 38,
+    exceptionCaught = 40,
+    moveToDeathRowFailed = 41,
+    cacheNotRebuilt = 43,
+    cachedContainerWithoutMetadata = 44,
+    cacheAddFailed = 45,
+    cacheRemoveFailed = 46,
+    cacheInputInvalid = 47,
+    directoryNotRenamed = 48,
+    notEntitled = 55,
+    usersDiffer = 56,
+    entitlementFileNotWritten = 59,
+    entitlementCountsDiffer = 60,
+    lockedAndNotRetried = 61,
+    ownerNotChanged = 62,
+};
+
+} // namespace zor

@@ -8,6 +8,7 @@
 #include "base/ZORError.h"
 #include "base/ZORLocks.h"
 #include "ipc/Identifiers.h"
+#include "platform/Errno.h"
 #include "platform/Process.h"
 #include "store/ZORContainerCache.h"
 
@@ -77,9 +78,27 @@ struct ContainerAddress {
 };
 
 /// Error 11, logged under `function`.
-Result<void> checkAddress(const Log& log, const char* function, const ContainerAddress& address);
+inline Result<void> checkAddress(const Log& log, const char* function, const ContainerAddress& address) {
+    if (address.uuid && isValidClass(address.containerClass))
+        return {};
+    return Reporter(log, function)
+        .error(ErrorCode::invalidObject, "Can't act on an invalid object: userId: %u, UUID: %s, Class: %ld",
+               address.userId, address.uuid ? address.uuid->string().c_str() : "(null)",
+               static_cast<long>(address.containerClass));
+}
 /// The cache's record of a checked address, whose lock is `held`. Error 21, logged under `function`, or 38.
-Result<std::shared_ptr<ZORMetadata>> knownContainer(const Log& log, ZORContainerCache& cache, const char* function,
-                                                    const ContainerAddress& address, const IdentifierLock& held);
+inline Result<std::shared_ptr<ZORMetadata>> knownContainer(const Log& log, ZORContainerCache& cache,
+                                                           const char* function, const ContainerAddress& address,
+                                                           const IdentifierLock& held) {
+    const std::string uuid = address.uuid->string();
+    ZOR_ASSERT(held.identifier() == uuid);
+    auto record = TRY(cache.containerForUser(address.userId, address.containerClass,
+                                             address.identifier ? &*address.identifier : nullptr, uuid));
+    if (record)
+        return record;
+    return Reporter(log, function)
+        .error(ErrorCode::notFound, "No Container with userId: %u UUID: %s, identifier: %s, Class: %ld", address.userId,
+               uuid.c_str(), ZOR_SHOWN(address.identifier), static_cast<long>(address.containerClass));
+}
 
 } // namespace zor

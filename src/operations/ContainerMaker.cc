@@ -1,12 +1,11 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "operations/ContainerMaker.h"
 
-#include "base/BlockingScope.h"
-#include "fs/AtomicFile.h"
-#include "fs/ItemStatus.h"
+#include "base/Mutex.h"
+#include "fs/Durability.h"
+#include "fs/MountFences.h"
 #include "os/FileDescriptor.h"
 #include "plist/Codec.h"
-#include "store/Names.h"
 #include "store/StorePlaces.h"
 
 #include <algorithm>

@@ -18,7 +18,7 @@
 #include "fs/Durability.h"
 #include "fs/ZORFileManager.h"
 #include "operations/DeathRow.h"
-#include "store/ZORGlobalConfiguration.h"
+#include "store/Configuration.h"
 #include "store/ZORMetadata.h"
 #include "store/ZORWhitelist.h"
 

@@ -19,9 +19,9 @@
 #include "operations/DeathRow.h"
 #include "operations/LastingMoves.h"
 #include "operations/ReplaceRecovery.h"
+#include "store/Configuration.h"
 #include "store/ZORContainerCache.h"
 #include "store/ZOREntitlementMapping.h"
-#include "store/ZORGlobalConfiguration.h"
 
 #include <cstdint>
 #include <memory>

@@ -1,11 +1,11 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "operations/DeathRow.h"
 
-#include "fs/AtomicFile.h"
+#include "fs/Durability.h"
 #include "fs/FileSystemDeathRow.h"
 #include "fs/Names.h"
 #include "os/FileDescriptor.h"
-#include "store/Names.h"
+#include "store/StorePlaces.h"
 
 #include <cerrno>
 #include <cstdio>

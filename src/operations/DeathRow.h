@@ -18,13 +18,13 @@
 // Any thread; takes no identifier lock.
 #pragma once
 
-#include "base/FileURL.h"
 #include "base/Mutex.h"
 #include "base/ZORError.h"
 #include "fs/Durability.h"
+#include "fs/PathResolver.h"
 #include "fs/ZORFileManager.h"
 #include "operations/Basics.h"
-#include "store/ZORGlobalConfiguration.h"
+#include "store/Configuration.h"
 
 #include <atomic>
 #include <cerrno>

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "operations/DiskUsage.h"
 
-#include "base/BlockingScope.h"
+#include "base/Mutex.h"
 #include "ipc/Protocol.h"
 
 #include <cerrno>

@@ -15,15 +15,15 @@
 // change is planned anew. Any thread.
 #pragma once
 
-#include "base/FileURL.h"
 #include "base/Mutex.h"
 #include "base/ZORError.h"
+#include "fs/PathResolver.h"
 #include "operations/Basics.h"
-#include "operations/ContainerRemoval.h"
+#include "operations/Deletion.h"
 #include "operations/ZORGroupManager.h"
 #include "plist/Value.h"
+#include "store/Configuration.h"
 #include "store/ZOREntitlementMapping.h"
-#include "store/ZORGlobalConfiguration.h"
 
 #include <optional>
 #include <string>

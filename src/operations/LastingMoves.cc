@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "operations/LastingMoves.h"
 
-#include "base/BlockingScope.h"
+#include "base/Mutex.h"
 #include "os/FileDescriptor.h"
 
 #include <algorithm>

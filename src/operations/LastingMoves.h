@@ -8,10 +8,10 @@
 #pragma once
 
 #include "base/ContainerClass.h"
-#include "base/FileURL.h"
 #include "base/Log.h"
 #include "base/ZORError.h"
 #include "fs/Durability.h"
+#include "fs/PathResolver.h"
 #include "fs/ZORFileManager.h"
 #include "platform/Device.h"
 #include "platform/Errno.h"

@@ -3,7 +3,7 @@
 // lock.
 #include "operations/Replace.h"
 
-#include "base/BlockingScope.h"
+#include "base/Mutex.h"
 #include "fs/FileSystemDeathRow.h"
 #include "operations/ReplaceProgress.h"
 #include "store/StorePlaces.h"

@@ -44,7 +44,7 @@
 #include "operations/LastingMoves.h"
 #include "operations/ReplaceRecovery.h"
 #include "os/FileDescriptor.h"
-#include "store/ZORGlobalConfiguration.h"
+#include "store/Configuration.h"
 #include "store/ZORWhitelist.h"
 
 #include <cstdint>

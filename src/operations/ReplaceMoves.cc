@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // The moves of a replace, how they are undone, and what they leave to be tidied up. Nothing here waits for the disk but
 // cleanUpReplace where the moves have to be on the disk before the journal can be gone; it runs without the lock then.
-#include "fs/ItemStatus.h"
+#include "fs/MountFences.h"
 #include "operations/ReplaceProgress.h"
 #include "store/StorePlaces.h"
 

@@ -1,10 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "operations/ReplaceRecovery.h"
 
-#include "fs/AtomicFile.h"
+#include "fs/Durability.h"
 #include "fs/FileSystemDeathRow.h"
-#include "fs/ItemStatus.h"
-#include "store/Names.h"
+#include "fs/MountFences.h"
 #include "store/ReplaceJournal.h"
 #include "store/StorePlaces.h"
 

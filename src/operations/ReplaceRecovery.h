@@ -12,17 +12,17 @@
 #pragma once
 
 #include "base/ContainerClass.h"
-#include "base/FileURL.h"
 #include "base/ZORError.h"
 #include "base/ZORLocks.h"
+#include "fs/PathResolver.h"
 #include "fs/ZORFileManager.h"
 #include "ipc/Identifiers.h"
 #include "operations/DeathRow.h"
 #include "operations/LastingMoves.h"
+#include "store/Configuration.h"
 #include "store/ReplaceJournal.h"
 #include "store/SetupProgress.h"
 #include "store/ZORContainerCache.h"
-#include "store/ZORGlobalConfiguration.h"
 
 #include <cerrno>
 #include <cstdint>

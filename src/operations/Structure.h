@@ -11,8 +11,8 @@
 // Any thread; each takes the container's lock.
 #pragma once
 
-#include "base/FileURL.h"
 #include "base/ZORError.h"
+#include "fs/PathResolver.h"
 #include "fs/ZORFileManager.h"
 #include "operations/Basics.h"
 #include "operations/LastingMoves.h"

@@ -3,7 +3,7 @@
 
 #include "base/ContainerClass.h"
 #include "fs/PathResolver.h"
-#include "store/Names.h"
+#include "store/StorePlaces.h"
 
 #include <algorithm>
 #include <array>

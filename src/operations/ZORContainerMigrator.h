@@ -11,13 +11,13 @@
 #pragma once
 
 #include "base/ContainerClass.h"
-#include "base/FileURL.h"
 #include "base/ZORError.h"
+#include "fs/PathResolver.h"
 #include "operations/DeathRow.h"
 #include "operations/LastingMoves.h"
+#include "store/Configuration.h"
 #include "store/SetupProgress.h"
 #include "store/ZORContainerCache.h"
-#include "store/ZORGlobalConfiguration.h"
 #include "store/ZORWhitelist.h"
 
 #include <cstdint>

@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "operations/ZORDataProtectionChangeOperation.h"
 
-#include "base/Assert.h"
-#include "base/BlockingScope.h"
+#include "base/Mutex.h"
+#include "platform/Errno.h"
 
 #include <atomic>
 #include <cerrno>

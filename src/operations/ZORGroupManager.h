@@ -10,13 +10,13 @@
 #include "base/ZORError.h"
 #include "operations/Basics.h"
 #include "operations/ContainerMaker.h"
-#include "operations/ContainerRemoval.h"
 #include "operations/Creation.h"
+#include "operations/Deletion.h"
 #include "operations/ReplaceRecovery.h"
+#include "store/Configuration.h"
 #include "store/EntitlementFile.h"
 #include "store/SetupProgress.h"
 #include "store/ZOREntitlementMapping.h"
-#include "store/ZORGlobalConfiguration.h"
 
 #include <cstdint>
 #include <functional>

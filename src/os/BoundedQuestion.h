@@ -7,7 +7,6 @@
 // when the process ends.
 #pragma once
 
-#include "base/BlockingScope.h"
 #include "base/Mutex.h"
 
 #include <algorithm>

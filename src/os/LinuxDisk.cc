@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "os/LinuxDisk.h"
 
-#include "base/BlockingScope.h"
-#include "base/Try.h"
+#include "base/Mutex.h"
 #include "os/FileDescriptor.h"
+#include "platform/Errno.h"
 
 #include <cerrno>
 #include <cstdio>

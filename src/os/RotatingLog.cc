@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "os/RotatingLog.h"
 
-#include "base/Format.h"
+#include "base/Log.h"
 #include "plist/Text.h"
 
 #include <algorithm>

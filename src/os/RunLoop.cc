@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "os/RunLoop.h"
 
-#include "base/Assert.h"
+#include "platform/Errno.h"
 
 #include <algorithm>
 #include <array>

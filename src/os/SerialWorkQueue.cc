@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "os/SerialWorkQueue.h"
 
-#include "base/Assert.h"
+#include "platform/Errno.h"
 
 #include <exception>
 #include <pthread.h>

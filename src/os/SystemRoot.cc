@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "os/SystemRoot.h"
 
-#include "base/Try.h"
 #include "os/FileDescriptor.h"
+#include "platform/Errno.h"
 
 #include <algorithm>
 #include <cerrno>

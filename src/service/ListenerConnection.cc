@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "service/ListenerConnection.h"
 
-#include "base/Format.h"
+#include "base/Log.h"
 #include "ipc/Frame.h"
 #include "plist/Codec.h"
 

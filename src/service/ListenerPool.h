@@ -21,7 +21,6 @@
 // state of their threads.
 #pragma once
 
-#include "base/BlockingScope.h"
 #include "base/Mutex.h"
 #include "os/FileDescriptor.h"
 #include "service/ListenerShares.h"

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "service/ServiceListener.h"
 
-#include "base/Try.h"
+#include "platform/Errno.h"
 #include "service/ListenerConnection.h"
 
 #include <cerrno>

@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "service/StatusSocket.h"
 
-#include "base/Try.h"
 #include "ipc/Frame.h"
+#include "platform/Errno.h"
 #include "plist/Codec.h"
 
 #include <cerrno>

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/EntitlementFile.h"
 
-#include "fs/AtomicFile.h"
+#include "fs/Durability.h"
 
 #include <algorithm>
 

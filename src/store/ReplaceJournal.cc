@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ReplaceJournal.h"
 
-#include "base/BlockingScope.h"
-#include "fs/AtomicFile.h"
+#include "base/Mutex.h"
+#include "fs/Durability.h"
 
 #include <algorithm>
 #include <array>

@@ -6,9 +6,9 @@
 #pragma once
 
 #include "base/ContainerClass.h"
-#include "base/FileURL.h"
 #include "base/Mutex.h"
 #include "base/ZORError.h"
+#include "fs/PathResolver.h"
 #include "fs/ZORFileManager.h"
 #include "ipc/Identifiers.h"
 

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/SetupProgress.h"
 
-#include "fs/AtomicFile.h"
+#include "fs/Durability.h"
 
 #include <ctime>
 #include <string>

@@ -2,11 +2,11 @@
 // The progress of a set-up: what earlier ones have done once and for all, and what this launch's does.
 #pragma once
 
-#include "base/FileURL.h"
 #include "base/ZORError.h"
+#include "fs/PathResolver.h"
 #include "fs/ZORFileManager.h"
 #include "platform/Device.h"
-#include "store/ZORGlobalConfiguration.h"
+#include "store/Configuration.h"
 
 #include <chrono>
 #include <cstdint>

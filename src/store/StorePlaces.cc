@@ -1,11 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/StorePlaces.h"
 
-#include "base/Assert.h"
 #include "fs/ZORFileManager.h"
 #include "os/FileDescriptor.h"
 #include "os/SystemRoot.h"
-#include "store/Names.h"
+#include "platform/Errno.h"
 
 #include <cerrno>
 #include <fcntl.h>
@@ -117,6 +116,31 @@ bool isMissing(const platform::SystemRoot& root, const std::string& path, int fl
 }
 
 } // namespace
+
+ContainerPlace::ContainerPlace(std::shared_ptr<const ContainerParent> parent, std::string_view name)
+    : parent_(std::move(parent)) {
+    const auto uuid = UUID::parse(name);
+    if (uuid && uuid->string() == name)
+        uuid_ = *uuid;
+    else
+        parent_ = std::make_shared<const ContainerParent>(parent_->path, std::string(name));
+}
+
+ContainerPlace::ContainerPlace(const FileURL& url)
+    : ContainerPlace(std::make_shared<const ContainerParent>(url.deletingLastPathComponent().path()),
+                     url.lastPathComponent()) {}
+
+FileURL ContainerPlace::url() const {
+    if (empty())
+        return {};
+    const std::string own = name();
+    std::string path;
+    path.reserve(parentPath().size() + 1 + own.size());
+    path += parentPath();
+    path += '/';
+    path += own;
+    return FileURL::directory(std::move(path));
+}
 
 std::vector<std::string> missingOf(const platform::SystemRoot& root) {
     std::vector<std::string> missing;

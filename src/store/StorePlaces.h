@@ -1,24 +1,73 @@
 // SPDX-License-Identifier: Apache-2.0
-// The places of everything in the store, below a system root. Paths are put together here and nothing else: nothing is
-// made, nothing is looked at. ZORGlobalConfiguration makes the directories; a reader that only looks needs no more than
-// this.
+// The places of everything in the store, below a system root, and their names. Paths are put together here and nothing
+// else: nothing is made, nothing is looked at. ZORGlobalConfiguration makes the directories; a reader that only looks
+// needs no more than this.
 //
 // Immutable after it is made; any thread.
 #pragma once
 
 #include "base/ContainerClass.h"
-#include "base/FileURL.h"
+#include "fs/Names.h"
 #include "fs/PathResolver.h"
 #include "fs/ZORFileManager.h"
+#include "ipc/Identifiers.h"
 #include "os/SystemRoot.h"
 
 #include <array>
+#include <memory>
 #include <optional>
 #include <span>
 #include <string>
 #include <string_view>
 #include <sys/types.h>
 #include <vector>
+
+namespace zor::names {
+
+// Every name that the store has on disk, spelled here (and, for those that the file manager knows too, in fs/Names.h)
+// and nowhere else.
+
+// Fixed places, below the system root.
+inline constexpr std::string_view rootHome = "/private/var/root";
+inline constexpr std::string_view brevadHome = "/private/var/brevad";
+inline constexpr std::string_view sharedContainers = "/private/var/containers";
+inline constexpr std::string_view temporary = "/tmp";
+/// The place where an older system kept the bundle containers too.
+inline constexpr std::string_view formerContainers = "/private/var/mobile/Containers";
+
+// Below a home.
+inline constexpr std::string_view logs = "Library/Logs/Zorvane";
+inline constexpr std::string_view caches = "Library/Caches/com.veltra.zorvaned";
+inline constexpr std::string_view library = "Library/Zorvane";
+inline constexpr std::string_view userContainers = "Containers";
+/// The levels of the caches directory, for where each is made by itself.
+inline constexpr std::array<std::string_view, 3> cachesLevels = {"Library", "Caches", "com.veltra.zorvaned"};
+
+// Below the caches and library directories.
+inline constexpr std::string_view transient = "Temp";
+inline constexpr std::string_view staging = "Staging";
+inline constexpr std::string_view deathrow = "Dead";
+inline constexpr std::string_view replace = "Replace";
+inline constexpr std::string_view bundle = "Bundle";
+
+/// Extended attribute of what a deletion pass could not remove and moved to the directory for temporary files: the
+/// first where the daemon is root.
+inline constexpr const char* undeletedAttribute = "trusted.zorvane.undeleted";
+inline constexpr const char* undeletedAttributeUser = "user.zorvane.undeleted";
+
+/// In every data container: what is there for the while that its process runs.
+inline constexpr const char* containerTemporary = "tmp";
+
+/// In the library directory: what each identifier is entitled to.
+inline constexpr const char* entitlementFile = "zor_entitlements.plist";
+/// The name that an entitlement file gets that cannot be read; its presence stops every pass that deletes on its word.
+inline constexpr const char* unreadableEntitlementFile = "zor_entitlements.plist.unreadable";
+
+/// In the library directory: what has been migrated, once for the device.
+inline constexpr std::string_view bundleMigrationMarker = "zor_bundle_migration_complete.plist";
+inline constexpr std::string_view groupIdMigrationMarker = "zor_group_id_migration_complete.plist";
+
+} // namespace zor::names
 
 namespace zor {
 
@@ -70,6 +119,33 @@ private:
     const FileURL sharedContainersDirectory_;
     const FileURL temporaryDirectory_;
     const FileURL formerContainersDirectory_;
+};
+
+/// The directory that a container lies in: many share one.
+struct ContainerParent {
+    std::string path;
+    /// The name of the one container that has it for itself, because that is no UUID in canonical form; else empty.
+    std::string childName{};
+};
+
+/// The place of a container: its directory, and its own name in it.
+class ContainerPlace {
+public:
+    ContainerPlace() = default;
+    /// `parent` has no name of a child.
+    ContainerPlace(std::shared_ptr<const ContainerParent> parent, std::string_view name);
+    explicit ContainerPlace(const FileURL& url);
+
+    [[nodiscard]] bool empty() const { return !parent_; }
+    [[nodiscard]] std::string name() const { return hasOtherName() ? parent_->childName : uuid_.string(); }
+    [[nodiscard]] const std::string& parentPath() const { return parent_->path; }
+    [[nodiscard]] FileURL url() const;
+
+private:
+    [[nodiscard]] bool hasOtherName() const { return parent_ && !parent_->childName.empty(); }
+
+    std::shared_ptr<const ContainerParent> parent_;
+    UUID uuid_;
 };
 
 // The things that a system root has to hold before a daemon can serve it, and which the daemon does not make: it

@@ -1,11 +1,11 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ZORContainerCache.h"
 
-#include "base/Assert.h"
 #include "fs/PathResolver.h"
 #include "fs/SharedWork.h"
+#include "platform/Errno.h"
 #include "plist/Value.h"
-#include "store/Names.h"
+#include "store/StorePlaces.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -19,6 +19,9 @@ namespace {
 long number(ContainerClass containerClass) {
     return static_cast<long>(containerClass);
 }
+
+/// A class directory is read so often in a row while operations change the class meanwhile.
+constexpr int readsMax = 16;
 
 } // namespace
 
@@ -83,6 +86,92 @@ void ZORContainerCache::remove(ClassCache& cache, std::string_view identifier) {
         cache.infoBytesOf.erase(bytes);
     }
     cache.records.erase(known);
+}
+
+ZORContainerCache::ClassCache* ZORContainerCache::knownCache(const Key& key) {
+    const UserHome* const home = homeOf(key);
+    const auto known = caches_.find(key);
+    const bool counts = known != caches_.end() && (!home || known->second.homeGeneration == home->generation());
+    return counts ? &known->second : nullptr;
+}
+
+Result<ZORContainerCache::ClassCache*> ZORContainerCache::_getCacheForUserId(const Key& key, Wanted wanted) {
+    if (!configuration_.users().mayOwn(key.containerClass, key.userId))
+        return Reporter(log_, __func__)
+            .error(ErrorCode::cacheInputInvalid, "Invalid cache get-userId %u for class %ld", key.userId,
+                   static_cast<long>(key.containerClass));
+    for (int reads = 0; reads < readsMax;) {
+        ClassCache* const before = knownCache(key);
+        if (before && (wanted == Wanted::asKnown || !before->hidesSome))
+            return before;
+        if (beingRead_.contains(key)) {
+            const platform::BlockingScope blocking;
+            readEnded_.wait(cacheLock_);
+            continue;
+        }
+        ++reads;
+        if (!before)
+            ZOR_LOG(log_, logLevelDebug, "Rebuilding container class cache: %u-%s%s", key.userId,
+                    className(key.containerClass), suffix(key.transient));
+        const std::uint64_t serial = before ? before->serial : 0;
+        const std::uint64_t drops = drops_;
+        ClassCache built;
+        TRY(readUnlocked(key, [&]() -> Result<void> {
+            auto whole = readClassDirectory(key);
+            if (!whole)
+                return std::move(whole).error();
+            built = std::move(*whole);
+            return {};
+        }));
+        // An operation's later change of the class is not in what was read, or not as it is.
+        const ClassCache* const now = knownCache(key);
+        if (drops != drops_ || (now ? now->serial : 0) != serial)
+            continue;
+        if (now)
+            for (const Record& known : now->records)
+                if (const auto again = built.records.find(known);
+                    again != built.records.end() && (*again)->place().name() == known->place().name()) {
+                    const auto bytes = now->infoBytesOf.find(known.get());
+                    store(built, known, bytes == now->infoBytesOf.end() ? 0 : bytes->second);
+                }
+        ClassCache& cache = caches_[key] = std::move(built);
+        noteChange(cache);
+        if (wanted == Wanted::whole && cache.hidesSome)
+            return posixError(ZOR_HERE, Errno(ENOKEY),
+                              "An encryption whose key is away hides containers of user %u, class %s", key.userId,
+                              className(key.containerClass));
+        return &cache;
+    }
+    return posixError(ZOR_HERE, Errno(EAGAIN), "The containers of user %u, class %s, changed whenever they were read",
+                      key.userId, className(key.containerClass));
+}
+
+void ZORContainerCache::prepare(std::uint32_t userId, ContainerClass containerClass, bool transient) {
+    if (!isValidClass(containerClass) || !configuration_.users().mayOwn(containerClass, userId))
+        return;
+    (void)boundary_.run(ZOR_HERE, [&]() -> Result<void> {
+        const Key key{userId, containerClass, transient};
+        UserHome* const home = homeOf(key);
+        if (home && !configuration_.homeAnswers(userId, fs::MountFence::Asked::now)) {
+            (void)home->look(); // who asks under the lock finds all questions asked
+            return {};
+        }
+        const MutexLock held(cacheLock_);
+        (void)_getCacheForUserId(key);
+        return {};
+    });
+}
+
+void ZORContainerCache::prepare(std::uint32_t userId, ContainerClass containerClass) {
+    prepare(userId, containerClass, false);
+    if (isValidClass(containerClass) && !lookForDirectory({userId, containerClass, true}))
+        prepare(userId, containerClass, true);
+}
+
+Errno ZORContainerCache::lookForDirectory(const Key& key) {
+    const auto place = configuration_.placeOfClass(key.userId, key.containerClass, key.transient);
+    const auto directory = place ? fileManager_.resolver().openDirectory(*place) : Errno(ENOENT);
+    return directory ? Errno() : directory.error();
 }
 
 Result<ZORContainerCache::Found> ZORContainerCache::findRecord(const Key& key, const std::string& identifier) {
@@ -300,27 +389,6 @@ Result<ZORContainerCache::PageOfRecords> ZORContainerCache::pageOfContainersForU
                 found.push_back({.record = *record, .place = (*record)->place()});
         }));
     return result;
-}
-
-ZORContainerCache::Held ZORContainerCache::heldByUser(std::uint32_t userId) {
-    std::uint64_t drops = 0;
-    bool isWhole = false;
-    {
-        const MutexLock held(cacheLock_);
-        isWhole = wholeUsers_.contains(userId);
-        drops = drops_;
-    }
-    const bool isBuilt = !isWhole && buildAllOfUser(userId);
-    const MutexLock held(cacheLock_);
-    if (isBuilt && drops == drops_)
-        wholeUsers_.insert(userId);
-    Held all;
-    for (auto cache = caches_.lower_bound(Key{userId, ContainerClass::undefined, false});
-         cache != caches_.end() && cache->first.userId == userId; ++cache) {
-        all.containers += cache->second.records.size();
-        all.infoBytes += cache->second.infoBytes;
-    }
-    return all;
 }
 
 Result<void> ZORContainerCache::addContainerMetadata(const Record& record, std::uint32_t userId, ContainerPlace place,

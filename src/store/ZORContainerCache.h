@@ -20,11 +20,12 @@
 #include "base/ZORError.h"
 #include "fs/Durability.h"
 #include "platform/Errno.h"
-#include "store/ZORGlobalConfiguration.h"
+#include "store/Configuration.h"
 #include "store/ZORMetadata.h"
 
 #include <chrono>
 #include <cstddef>
+#include <functional>
 #include <map>
 #include <memory>
 #include <optional>
@@ -171,8 +172,7 @@ private:
     /// The class cache as it is; nullptr when there is none, or none of the home that is there.
     ClassCache* knownCache(const Key& key) ZOR_REQUIRES(cacheLock_);
     /// Lets the mutex go while it runs `read`; other readers of the class wait meanwhile.
-    template <typename Read>
-    auto readUnlocked(const Key& key, Read&& read) ZOR_REQUIRES(cacheLock_);
+    Result<void> readUnlocked(const Key& key, const std::function<Result<void>()>& read) ZOR_REQUIRES(cacheLock_);
     Result<ClassCache> readClassDirectory(const Key& key);
     /// The error for which the class has no directory now. One that is missing is not made for this.
     Errno lookForDirectory(const Key& key);

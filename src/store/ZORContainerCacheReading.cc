@@ -1,10 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // The class directories as the cache reads them: for all that need one by one thread, without the mutex.
-#include "base/BlockingScope.h"
 #include "base/Mutex.h"
-#include "fs/ItemStatus.h"
 #include "fs/PathResolver.h"
 #include "fs/SharedWork.h"
+#include "fs/TreeWalker.h"
 #include "store/ZORContainerCache.h"
 #include "store/ZORMetadata.h"
 
@@ -162,9 +161,6 @@ Result<void> ClassDirectoryReader::forEach(const std::function<void(std::shared_
 constexpr std::chrono::seconds lookOverPauseMin{1};
 constexpr int lookOverShare = 100;
 
-/// A class directory is read so often in a row while operations change the class meanwhile.
-constexpr int readsMax = 16;
-
 /// The reading of so many leaves holes in the memory, a tenth of the size of the records that it made.
 constexpr std::size_t recordsWithHoles = 10'000;
 
@@ -176,17 +172,9 @@ void giveHolesBack() {
 
 } // namespace
 
-ZORContainerCache::ClassCache* ZORContainerCache::knownCache(const Key& key) {
-    const UserHome* const home = homeOf(key);
-    const auto known = caches_.find(key);
-    const bool counts = known != caches_.end() && (!home || known->second.homeGeneration == home->generation());
-    return counts ? &known->second : nullptr;
-}
-
-template <typename Read>
-auto ZORContainerCache::readUnlocked(const Key& key, Read&& read) {
+Result<void> ZORContainerCache::readUnlocked(const Key& key, const std::function<Result<void>()>& read) {
     const platform::BlockingScope blocking;
-    std::optional<decltype(read())> result;
+    std::optional<Result<void>> result;
     std::exception_ptr thrown;
     beingRead_.insert(key);
     cacheLock_.unlock();
@@ -201,78 +189,6 @@ auto ZORContainerCache::readUnlocked(const Key& key, Read&& read) {
     if (thrown)
         std::rethrow_exception(thrown);
     return std::move(*result);
-}
-
-Result<ZORContainerCache::ClassCache*> ZORContainerCache::_getCacheForUserId(const Key& key, Wanted wanted) {
-    if (!configuration_.users().mayOwn(key.containerClass, key.userId))
-        return Reporter(log_, __func__)
-            .error(ErrorCode::cacheInputInvalid, "Invalid cache get-userId %u for class %ld", key.userId,
-                   static_cast<long>(key.containerClass));
-    for (int reads = 0; reads < readsMax;) {
-        ClassCache* const before = knownCache(key);
-        if (before && (wanted == Wanted::asKnown || !before->hidesSome))
-            return before;
-        if (beingRead_.contains(key)) {
-            const platform::BlockingScope blocking;
-            readEnded_.wait(cacheLock_);
-            continue;
-        }
-        ++reads;
-        if (!before)
-            ZOR_LOG(log_, logLevelDebug, "Rebuilding container class cache: %u-%s%s", key.userId,
-                    className(key.containerClass), suffix(key.transient));
-        const std::uint64_t serial = before ? before->serial : 0;
-        const std::uint64_t drops = drops_;
-        ClassCache built = TRY(readUnlocked(key, [&] { return readClassDirectory(key); }));
-        // An operation's later change of the class is not in what was read, or not as it is.
-        const ClassCache* const now = knownCache(key);
-        if (drops != drops_ || (now ? now->serial : 0) != serial)
-            continue;
-        if (now)
-            for (const Record& known : now->records)
-                if (const auto again = built.records.find(known);
-                    again != built.records.end() && (*again)->place().name() == known->place().name()) {
-                    const auto bytes = now->infoBytesOf.find(known.get());
-                    store(built, known, bytes == now->infoBytesOf.end() ? 0 : bytes->second);
-                }
-        ClassCache& cache = caches_[key] = std::move(built);
-        noteChange(cache);
-        if (wanted == Wanted::whole && cache.hidesSome)
-            return posixError(ZOR_HERE, Errno(ENOKEY),
-                              "An encryption whose key is away hides containers of user %u, class %s", key.userId,
-                              className(key.containerClass));
-        return &cache;
-    }
-    return posixError(ZOR_HERE, Errno(EAGAIN), "The containers of user %u, class %s, changed whenever they were read",
-                      key.userId, className(key.containerClass));
-}
-
-void ZORContainerCache::prepare(std::uint32_t userId, ContainerClass containerClass, bool transient) {
-    if (!isValidClass(containerClass) || !configuration_.users().mayOwn(containerClass, userId))
-        return;
-    (void)boundary_.run(ZOR_HERE, [&]() -> Result<void> {
-        const Key key{userId, containerClass, transient};
-        UserHome* const home = homeOf(key);
-        if (home && !configuration_.homeAnswers(userId, fs::MountFence::Asked::now)) {
-            (void)home->look(); // who asks under the lock finds all questions asked
-            return {};
-        }
-        const MutexLock held(cacheLock_);
-        (void)_getCacheForUserId(key);
-        return {};
-    });
-}
-
-void ZORContainerCache::prepare(std::uint32_t userId, ContainerClass containerClass) {
-    prepare(userId, containerClass, false);
-    if (isValidClass(containerClass) && !lookForDirectory({userId, containerClass, true}))
-        prepare(userId, containerClass, true);
-}
-
-Errno ZORContainerCache::lookForDirectory(const Key& key) {
-    const auto place = configuration_.placeOfClass(key.userId, key.containerClass, key.transient);
-    const auto directory = place ? fileManager_.resolver().openDirectory(*place) : Errno(ENOENT);
-    return directory ? Errno() : directory.error();
 }
 
 Result<ZORContainerCache::ClassCache> ZORContainerCache::readClassDirectory(const Key& key) {
@@ -352,6 +268,27 @@ bool ZORContainerCache::lookOver(const Key& key, const Found& gone) {
     }
     noteChange(now->second);
     return true;
+}
+
+ZORContainerCache::Held ZORContainerCache::heldByUser(std::uint32_t userId) {
+    std::uint64_t drops = 0;
+    bool isWhole = false;
+    {
+        const MutexLock held(cacheLock_);
+        isWhole = wholeUsers_.contains(userId);
+        drops = drops_;
+    }
+    const bool isBuilt = !isWhole && buildAllOfUser(userId);
+    const MutexLock held(cacheLock_);
+    if (isBuilt && drops == drops_)
+        wholeUsers_.insert(userId);
+    Held all;
+    for (auto cache = caches_.lower_bound(Key{userId, ContainerClass::undefined, false});
+         cache != caches_.end() && cache->first.userId == userId; ++cache) {
+        all.containers += cache->second.records.size();
+        all.infoBytes += cache->second.infoBytes;
+    }
+    return all;
 }
 
 bool ZORContainerCache::buildAllOfUser(std::uint32_t userId) {

@@ -1,13 +1,13 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ZOREntitlementMapping.h"
 
-#include "base/Assert.h"
-#include "base/BlockingScope.h"
 #include "base/ContainerClass.h"
-#include "fs/AtomicFile.h"
+#include "base/Mutex.h"
+#include "fs/Durability.h"
 #include "ipc/Protocol.h"
+#include "platform/Errno.h"
 #include "plist/Value.h"
-#include "store/Names.h"
+#include "store/StorePlaces.h"
 
 #include <algorithm>
 #include <cerrno>

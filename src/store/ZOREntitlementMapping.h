@@ -19,9 +19,9 @@
 #include "base/ZORError.h"
 #include "base/ZORLocks.h"
 #include "plist/Value.h"
+#include "store/Configuration.h"
 #include "store/EntitlementFile.h"
 #include "store/SetupProgress.h"
-#include "store/ZORGlobalConfiguration.h"
 
 #include <array>
 #include <atomic>

@@ -1,12 +1,12 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ZORMetadata.h"
 
-#include "fs/AtomicFile.h"
+#include "fs/Durability.h"
 #include "fs/PathResolver.h"
 #include "ipc/Identifiers.h"
 #include "ipc/Protocol.h"
 #include "plist/Codec.h"
-#include "store/Names.h"
+#include "store/StorePlaces.h"
 
 #include <bit>
 #include <cerrno>
@@ -49,43 +49,6 @@ std::string_view withoutLastComponent(std::string_view path) {
 
 #define ZOR_REFUSE(rule, ...)                                                                                          \
     return refusal(MetadataRule::rule, ErrorCode::metadataInvalid, __LINE__, formatted(__VA_ARGS__))
-
-ContainerPlace::ContainerPlace(std::shared_ptr<const ContainerParent> parent, std::string_view name)
-    : parent_(std::move(parent)) {
-    const auto uuid = UUID::parse(name);
-    if (uuid && uuid->string() == name)
-        uuid_ = *uuid;
-    else
-        parent_ = std::make_shared<const ContainerParent>(parent_->path, std::string(name));
-}
-
-ContainerPlace::ContainerPlace(const FileURL& url)
-    : ContainerPlace(std::make_shared<const ContainerParent>(url.deletingLastPathComponent().path()),
-                     url.lastPathComponent()) {}
-
-FileURL ContainerPlace::url() const {
-    if (empty())
-        return {};
-    const std::string own = name();
-    std::string path;
-    path.reserve(parentPath().size() + 1 + own.size());
-    path += parentPath();
-    path += '/';
-    path += own;
-    return FileURL::directory(std::move(path));
-}
-
-UUID ZORMetadata::uuid() const {
-    const std::array<std::uint64_t, 2> halves{uuid_[0].load(std::memory_order_acquire),
-                                              uuid_[1].load(std::memory_order_acquire)};
-    return UUID(std::bit_cast<UUID::Bytes>(halves));
-}
-
-void ZORMetadata::setUuid(const UUID& uuid) {
-    const auto halves = std::bit_cast<std::array<std::uint64_t, 2>>(uuid.bytes());
-    uuid_[0].store(halves[0], std::memory_order_release);
-    uuid_[1].store(halves[1], std::memory_order_release);
-}
 
 std::optional<int> ZORMetadata::recordedProtectionClass() const {
     const plist::Value* value = info_ ? info_->find(ipc::infoKeys::contentProtectionClass) : nullptr;

@@ -9,14 +9,16 @@
 #pragma once
 
 #include "base/ContainerClass.h"
-#include "base/FileURL.h"
 #include "base/ZORError.h"
+#include "fs/PathResolver.h"
 #include "fs/ZORFileManager.h"
 #include "ipc/Identifiers.h"
 #include "plist/Value.h"
+#include "store/StorePlaces.h"
 
 #include <array>
 #include <atomic>
+#include <bit>
 #include <expected>
 #include <memory>
 #include <optional>
@@ -24,33 +26,6 @@
 #include <string>
 
 namespace zor {
-
-/// The directory that a container lies in: many share one.
-struct ContainerParent {
-    std::string path;
-    /// The name of the one container that has it for itself, because that is no UUID in canonical form; else empty.
-    std::string childName{};
-};
-
-/// The place of a container: its directory, and its own name in it.
-class ContainerPlace {
-public:
-    ContainerPlace() = default;
-    /// `parent` has no name of a child.
-    ContainerPlace(std::shared_ptr<const ContainerParent> parent, std::string_view name);
-    explicit ContainerPlace(const FileURL& url);
-
-    [[nodiscard]] bool empty() const { return !parent_; }
-    [[nodiscard]] std::string name() const { return hasOtherName() ? parent_->childName : uuid_.string(); }
-    [[nodiscard]] const std::string& parentPath() const { return parent_->path; }
-    [[nodiscard]] FileURL url() const;
-
-private:
-    [[nodiscard]] bool hasOtherName() const { return parent_ && !parent_->childName.empty(); }
-
-    std::shared_ptr<const ContainerParent> parent_;
-    UUID uuid_;
-};
 
 class ZORMetadata {
 public:
@@ -69,8 +44,16 @@ public:
     /// The internal UUID, which clients know; not the one in the directory's name.
     /// A reader without the lock that guards it may get half of either, and sees the writer that gave it the other half
     /// (ZORLocks::quietGeneration).
-    [[nodiscard]] UUID uuid() const;
-    void setUuid(const UUID& uuid);
+    [[nodiscard]] UUID uuid() const {
+        const std::array<std::uint64_t, 2> halves{uuid_[0].load(std::memory_order_acquire),
+                                                  uuid_[1].load(std::memory_order_acquire)};
+        return UUID(std::bit_cast<UUID::Bytes>(halves));
+    }
+    void setUuid(const UUID& uuid) {
+        const auto halves = std::bit_cast<std::array<std::uint64_t, 2>>(uuid.bytes());
+        uuid_[0].store(halves[0], std::memory_order_release);
+        uuid_[1].store(halves[1], std::memory_order_release);
+    }
     [[nodiscard]] ContainerClass containerClass() const { return static_cast<ContainerClass>(containerClass_); }
     [[nodiscard]] const std::string& identifier() const { return identifier_; }
     [[nodiscard]] const Info& info() const { return info_; }

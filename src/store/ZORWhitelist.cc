@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "store/ZORWhitelist.h"
 
-#include "fs/AtomicFile.h"
+#include "fs/Durability.h"
 #include "ipc/Identifiers.h"
 #include "os/SystemRoot.h"
 

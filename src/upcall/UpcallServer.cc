@@ -3,7 +3,7 @@
 
 #include "base/ContainerClass.h"
 #include "plist/Value.h"
-#include "store/Names.h"
+#include "store/StorePlaces.h"
 #include "upcall/packbuff/UpcallMessage.h"
 
 #include <cerrno>

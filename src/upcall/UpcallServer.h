@@ -14,7 +14,7 @@
 #include "fs/ZORFileManager.h"
 #include "operations/Creation.h"
 #include "platform/Service.h"
-#include "store/ZORGlobalConfiguration.h"
+#include "store/Configuration.h"
 #include "upcall/packbuff/Packbuff.h"
 #include "upcall/packbuff/UpcallMessage.h"
 

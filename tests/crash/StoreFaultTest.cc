@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "crash/Scenarios.h"
-#include "fs/AtomicFile.h"
+#include "fs/Durability.h"
 #include "support/FaultDisk.h"
 #include "support/LongRun.h"
 #include "support/PowerCut.h"

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-#include "fs/AtomicFile.h"
+#include "fs/Durability.h"
 #include "os/LinuxDisk.h"
 #include "support/Files.h"
 #include "support/PowerCut.h"

@@ -1,8 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
+#include "device/DataProtection.h"
 #include "device/DeviceQueries.h"
-#include "device/FileDeviceLockState.h"
 #include "device/LinkSandboxUserState.h"
-#include "device/XattrProtectionClass.h"
 #include "os/RunLoop.h"
 #include "os/SystemRoot.h"
 #include "support/FewDescriptors.h"

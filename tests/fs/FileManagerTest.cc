@@ -2,8 +2,8 @@
 // The file manager over a temporary root, with a disk that may fail, a log that keeps its lines, and a settable lock
 // state: directories, what it takes for existing, protection classes, files that are replaced whole, listing, moving,
 // and ownership of trees.
-#include "device/XattrProtectionClass.h"
-#include "fs/AtomicFile.h"
+#include "device/DataProtection.h"
+#include "fs/Durability.h"
 #include "fs/Names.h"
 #include "fs/ZORFileManager.h"
 #include "support/FaultDisk.h"

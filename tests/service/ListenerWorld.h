@@ -3,7 +3,7 @@
 // what the kernel says, and raw clients that may send any bytes.
 #pragma once
 
-#include "base/BlockingScope.h"
+#include "base/Mutex.h"
 #include "plist/Codec.h"
 #include "service/ServiceListener.h"
 #include "support/FewDescriptors.h"

@@ -2,7 +2,6 @@
 // A Disk before another one that brings all calls to one place, which may refuse them, make them or watch them.
 #pragma once
 
-#include "base/Try.h"
 #include "os/FileDescriptor.h"
 #include "platform/Disk.h"
 #include "platform/Errno.h"

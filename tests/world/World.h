@@ -12,7 +12,7 @@
 #include "daemon/LinuxPlatform.h"
 #include "os/LinuxDisk.h"
 #include "platform/Errno.h"
-#include "store/Names.h"
+#include "store/StorePlaces.h"
 #include "support/FaultDisk.h"
 #include "support/RecordingLog.h"
 #include "support/SettableRoles.h"

@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Assertion.h"
 
-#include "base/Format.h"
+#include "ipc/Identifiers.h"
 #include "ipc/Protocol.h"
 #include "os/FileDescriptor.h"
 #include "platform/Device.h"
@@ -47,8 +47,8 @@ zor::Errno tryLock(int file, int operation) {
 } // namespace
 
 Result<Freedom> awaitFreedom(const Root& root, const Options& options) {
-    const std::string name = platform::percentEncode(options.identifier);
-    if (name.size() > platform::componentBytesMax)
+    const std::string name = zor::ipc::percentEncode(options.identifier);
+    if (name.size() > zor::ipc::componentBytesMax)
         return Freedom::found; // the daemon holds none on such an identifier
     const std::string relative =
         std::string(zor::ipc::runtimeDirectory) + "/" + std::string(zor::ipc::assertionDirectory) + "/" + name;

@@ -2,9 +2,9 @@
 #include "Mounts.h"
 
 #include "Staging.h"
-#include "base/Try.h"
 #include "fs/MountFences.h"
 #include "os/FileDescriptor.h"
+#include "platform/Errno.h"
 #include "zorvane/Client.h"
 
 #include <algorithm>

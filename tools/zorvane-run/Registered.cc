@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Registered.h"
 
-#include "base/Try.h"
+#include "platform/Errno.h"
 #include "zorvane/Client.h"
 
 namespace zorvanerun {

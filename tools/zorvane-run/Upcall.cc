@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Upcall.h"
 
-#include "base/Try.h"
 #include "ipc/Protocol.h"
 #include "os/FileDescriptor.h"
+#include "platform/Errno.h"
 
 #include <algorithm>
 #include <cerrno>

@@ -16,8 +16,8 @@
 #include "Staging.h"
 #include "Supervisor.h"
 #include "Upcall.h"
-#include "base/Try.h"
 #include "os/FileDescriptor.h"
+#include "platform/Errno.h"
 
 #include <algorithm>
 #include <csignal>

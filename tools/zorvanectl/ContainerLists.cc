@@ -3,7 +3,7 @@
 
 #include "KnownContainer.h"
 #include "Users.h"
-#include "base/Try.h"
+#include "platform/Errno.h"
 
 #include <algorithm>
 #include <tuple>

@@ -5,12 +5,12 @@
 // Files that are there stay as they are, so a run that was stopped anywhere is finished by the next one: each file
 // appears whole, each directory is given to its owner as long as it is empty. No link is followed below the root.
 #include "Commands.h"
-#include "base/Try.h"
-#include "fs/AtomicFile.h"
+#include "fs/Durability.h"
 #include "identity/Users.h"
 #include "os/FileDescriptor.h"
 #include "os/LinuxDisk.h"
 #include "os/SystemRoot.h"
+#include "platform/Errno.h"
 #include "store/StorePlaces.h"
 
 #include <array>

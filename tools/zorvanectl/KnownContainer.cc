@@ -2,7 +2,7 @@
 #include "KnownContainer.h"
 
 #include "base/ContainerClass.h"
-#include "base/Try.h"
+#include "platform/Errno.h"
 
 #include <algorithm>
 

@@ -2,8 +2,7 @@
 #include "LostRecord.h"
 
 #include "KnownContainer.h"
-#include "device/FileDeviceLockState.h"
-#include "device/XattrProtectionClass.h"
+#include "device/DataProtection.h"
 #include "os/SystemRoot.h"
 
 namespace zorvanectl {

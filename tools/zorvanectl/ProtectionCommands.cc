@@ -3,11 +3,10 @@
 #include "Commands.h"
 #include "KnownContainer.h"
 #include "PendingChanges.h"
-#include "base/Try.h"
-#include "device/FileDeviceLockState.h"
-#include "device/XattrProtectionClass.h"
+#include "device/DataProtection.h"
 #include "os/FileDescriptor.h"
 #include "os/SystemRoot.h"
+#include "platform/Errno.h"
 
 #include <cerrno>
 #include <cstring>

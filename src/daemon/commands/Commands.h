@@ -3,12 +3,36 @@
 // reply. Any thread of the listener; one message of a connection at a time.
 #pragma once
 
-#include "daemon/CommandTable.h"
+#include "base/ContainerClass.h"
+#include "daemon/Operations.h"
+#include "daemon/ZORClientConnection.h"
 #include "ipc/Identifiers.h"
+#include "ipc/Protocol.h"
+#include "platform/Service.h"
 
 #include <cstdint>
+#include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
+
+namespace zor {
+
+/// The things that a handler works with. `request` and `reply` live as long as the call; a handler that replies later
+/// keeps `channel` and what it needs of the rest.
+struct CommandContext {
+    const plist::Dictionary& request;
+    plist::Dictionary& reply;
+    const std::shared_ptr<ZORClientConnection>& client;
+    const std::shared_ptr<platform::ReplyChannel>& channel;
+    UserIdentity& users;
+    Operations& operations;
+    const Log& log;
+    /// Success when the handler is entered; a handler that fails stores its code here.
+    ErrorCode& error;
+};
+
+} // namespace zor
 
 namespace zor::commands {
 
@@ -88,25 +112,14 @@ inline void storeError(CommandContext& context, const Result<void>& result) {
 void createOrLookupContainer(CommandContext& context);
 void listContainers(CommandContext& context);
 void deleteContainersOnDeathRow(CommandContext& context);
-
-// DeletionCommands.cc
-void stageContainersForDelete(CommandContext& context);
-void deleteContainer(CommandContext& context);
-
-// EntitlementCommands.cc
-void getGroupContainerPaths(CommandContext& context);
-void getGroupContainerIdentifiers(CommandContext& context);
-void getSystemContainerPath(CommandContext& context);
-void getSystemGroupContainerPaths(CommandContext& context);
-void getSystemGroupContainerPath(CommandContext& context);
-void processEntitlements(CommandContext& context);
-
-// InfoCommands.cc
 void setInfoValue(CommandContext& context);
 void getInfoValue(CommandContext& context);
 void getMetadata(CommandContext& context);
+void setDataProtection(CommandContext& context);
 
 // LifecycleCommands.cc
+void stageContainersForDelete(CommandContext& context);
+void deleteContainer(CommandContext& context);
 void replaceContainer(CommandContext& context);
 void recreateDefaultStructure(CommandContext& context);
 void regenerateDirectoryUUID(CommandContext& context);
@@ -115,7 +128,12 @@ void wipeDataContainerContent(CommandContext& context);
 void getDiskUsage(CommandContext& context);
 void retryTest(CommandContext& context);
 
-// ProtectionCommands.cc
-void setDataProtection(CommandContext& context);
+// EntitlementCommands.cc
+void getGroupContainerPaths(CommandContext& context);
+void getGroupContainerIdentifiers(CommandContext& context);
+void getSystemContainerPath(CommandContext& context);
+void getSystemGroupContainerPaths(CommandContext& context);
+void getSystemGroupContainerPath(CommandContext& context);
+void processEntitlements(CommandContext& context);
 
 } // namespace zor::commands

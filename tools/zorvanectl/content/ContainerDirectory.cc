@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "ContainerDirectory.h"
 
-#include "fs/AtomicFile.h"
+#include "fs/Durability.h"
 #include "fs/Names.h"
 #include "zorvane/Text.h"
 

@@ -5,8 +5,8 @@
 #include "ItemRules.h"
 #include "SealedDirectory.h"
 #include "Unpacker.h"
-#include "base/Try.h"
 #include "fs/Trees.h"
+#include "platform/Errno.h"
 #include "zorvane/Text.h"
 
 #include <algorithm>

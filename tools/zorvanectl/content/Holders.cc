@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "Holders.h"
 
-#include "base/Try.h"
+#include "platform/Errno.h"
 #include "zorvane/Text.h"
 
 #include <algorithm>

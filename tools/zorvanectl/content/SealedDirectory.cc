@@ -1,7 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "SealedDirectory.h"
 
-#include "fs/ItemStatus.h"
+#include "fs/TreeWalker.h"
 #include "fs/Trees.h"
 #include "os/FileDescriptor.h"
 #include "zorvane/Text.h"

@@ -2,8 +2,8 @@
 #include "Unpacker.h"
 
 #include "ItemRules.h"
-#include "base/Try.h"
 #include "os/FileDescriptor.h"
+#include "platform/Errno.h"
 #include "zorvane/Text.h"
 
 #include <algorithm>
