@@ -5,6 +5,7 @@
 #include "platform/Errno.h"
 
 #include <algorithm>
+#include <bit>
 #include <sched.h>
 
 namespace zor {
@@ -36,6 +37,13 @@ void sortOnce(std::vector<std::string>& identifiers) {
 
 } // namespace
 
+Touches Touches::only(std::initializer_list<std::string_view> identifiers) {
+    std::uint64_t groups = 0;
+    for (const std::string_view identifier : identifiers)
+        groups |= std::uint64_t{1} << identifierGroupOf(identifier);
+    return {false, groups};
+}
+
 void ZORLocks::_lock_identifier(std::vector<std::string> identifiers, LockMode mode) {
     sortOnce(identifiers);
     std::size_t taken = 0;
@@ -66,8 +74,22 @@ void ZORLocks::waitForAll(platform::ConditionVariable& condition) {
     condition.wait(mutex_);
 }
 
-void ZORLocks::take_one_lock(std::string_view identifier, LockMode mode) {
-    acquire(admit(identifier, mode), identifier, mode);
+void ZORLocks::begin(Touches touches) noexcept {
+    if (touches.all_)
+        ++anythingTouched_.begun;
+    for (std::uint64_t groups = touches.groups_; groups != 0; groups &= groups - 1)
+        ++groupTouched_[static_cast<std::size_t>(std::countr_zero(groups))].begun;
+}
+
+void ZORLocks::end(Touches touches) noexcept {
+    for (std::uint64_t groups = touches.groups_; groups != 0; groups &= groups - 1)
+        ++groupTouched_[static_cast<std::size_t>(std::countr_zero(groups))].ended;
+    if (touches.all_)
+        ++anythingTouched_.ended;
+}
+
+void ZORLocks::take_one_lock(std::string_view identifier, LockMode mode, Touches touches) {
+    acquire(admit(identifier, mode), identifier, mode, touches);
 }
 
 ZORLocks::Record& ZORLocks::admit(std::string_view identifier, LockMode mode) {
@@ -85,12 +107,10 @@ ZORLocks::Record& ZORLocks::admit(std::string_view identifier, LockMode mode) {
     else
         found = identifierToLockMap_.emplace(identifier, std::make_unique<Record>()).first;
     ++(mode == LockMode::writing ? identifierWriterCount_ : identifierReaderCount_);
-    if (mode == LockMode::writing)
-        ++writersBegun_;
     return *found->second;
 }
 
-void ZORLocks::acquire(Record& record, std::string_view identifier, LockMode mode) noexcept {
+void ZORLocks::acquire(Record& record, std::string_view identifier, LockMode mode, Touches touches) noexcept {
     if (log_.writes(logLevelDebug))
         log_.write(logLevelDebug, takeFunction, "Waiting to lock %.*s for %s", shownBytes(identifier),
                    identifier.data(), name(mode));
@@ -102,6 +122,8 @@ void ZORLocks::acquire(Record& record, std::string_view identifier, LockMode mod
         std::int32_t expected = 0;
         const bool wasFree = record.lockState.compare_exchange_strong(expected, -1);
         ZOR_ASSERT(wasFree);
+        record.touches = touches;
+        begin(touches);
     } else {
         if (!record.lock.try_lock_shared()) {
             const BlockingScope blocking;
@@ -128,7 +150,7 @@ void ZORLocks::unlock_one_lock(std::string_view identifier) noexcept {
         ZOR_ASSERT(identifierWriterCount_ > 0);
         record.lockState = 0;
         --identifierWriterCount_;
-        ++writersEnded_;
+        end(record.touches);
         if (identifierReaderCount_ == 0 && identifierWriterCount_ == 0)
             allWriter_.signal();
         if (identifierWriterCount_ == 0 && allReaderWriterState_ != -1)
@@ -151,7 +173,7 @@ void ZORLocks::unlock_one_lock(std::string_view identifier) noexcept {
     }
 }
 
-void ZORLocks::_lock_all_identifiers(LockMode mode) noexcept {
+void ZORLocks::_lock_all_identifiers(LockMode mode, Touches touches) noexcept {
     ZOR_LOG(log_, logLevelDebug, "Waiting to lock all identifiers for %s", name(mode));
     const MutexLock held(mutex_);
     if (mode == LockMode::writing) {
@@ -160,9 +182,9 @@ void ZORLocks::_lock_all_identifiers(LockMode mode) noexcept {
                 yield();
             else
                 waitForAll(allWriter_);
-        ZOR_ASSERT(writersBegun_ == writersEnded_);
         allReaderWriterState_ = -1;
-        ++writersBegun_;
+        touchedByHolder_ = touches;
+        begin(touches);
     } else {
         while (identifierWriterCount_ != 0 || allReaderWriterState_ == -1)
             waitForAll(allReader_);
@@ -180,7 +202,7 @@ void ZORLocks::unlock_all_identifiers() noexcept {
         }
         if (allReaderWriterState_ == -1) {
             allReaderWriterState_ = 0;
-            ++writersEnded_;
+            end(touchedByHolder_);
             allWriter_.signal();
             allReader_.broadcast();
             identifierWriter_.broadcast();
@@ -195,17 +217,31 @@ void ZORLocks::unlock_all_identifiers() noexcept {
     ZOR_LOG(log_, logLevelDebug, "Unlocked all identifiers");
 }
 
-std::optional<std::uint64_t> ZORLocks::quietGeneration() const noexcept {
-    // In this order: both only grow and no more end than begin, so when the second look finds no more than had ended
-    // before it, there was nobody at that moment.
-    const std::uint64_t ended = writersEnded_;
-    const std::uint64_t begun = writersBegun_;
+void ZORLocks::touch(Touches touches) noexcept {
+    const MutexLock held(mutex_);
+    ZOR_ASSERT(allReaderWriterState_ == -1);
+    const Touches more(touches.all_ && !touchedByHolder_.all_, touches.groups_ & ~touchedByHolder_.groups_);
+    begin(more);
+    touchedByHolder_ = {touchedByHolder_.all_ || more.all_, touchedByHolder_.groups_ | more.groups_};
+}
+
+std::optional<std::uint64_t> ZORLocks::quietGeneration(std::string_view identifier) const noexcept {
+    const Count& group = groupTouched_[identifierGroupOf(identifier)];
+    // In this order: all only grow and no more end than begin, so when the second look finds no more than had ended
+    // before it, there was nobody at that moment, of either kind.
+    const std::uint64_t ended = anythingTouched_.ended + group.ended;
+    const std::uint64_t begun = anythingTouched_.begun + group.begun;
     return begun == ended ? std::optional(begun) : std::nullopt;
 }
 
 std::size_t ZORLocks::identifiersInUse() const {
     const MutexLock held(mutex_);
     return identifierToLockMap_.size();
+}
+
+bool ZORLocks::allAreHeldForWriting() const {
+    const MutexLock held(mutex_);
+    return allReaderWriterState_ == -1;
 }
 
 } // namespace zor

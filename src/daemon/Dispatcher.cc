@@ -227,7 +227,8 @@ Dispatcher::checkEntitlementsAndInitClientObject(const ZORCommandTableRow& row, 
 }
 
 void Dispatcher::registerEntitlements(const std::string* identifier, const platform::IdentityGrant& grant) const {
-    const std::uint64_t generation = operations_.entitlements.generation();
+    const std::uint64_t generation =
+        operations_.entitlements.generation(identifier ? std::string_view(*identifier) : std::string_view());
     if (grant.registeredGeneration.get() == generation)
         return;
     static const plist::Dictionary byCaller{{std::string(entitlementMapKeys::registeredByCaller), true}};

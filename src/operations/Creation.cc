@@ -12,9 +12,9 @@ namespace zor {
 std::optional<ZORContainerCache::LiveContainer> lookUpUndisturbed(ZORLocks& locks, ZORContainerCache& cache,
                                                                   std::uint32_t userId, ContainerClass containerClass,
                                                                   const std::string& identifier) {
-    if (const auto before = locks.quietGeneration()) {
+    if (const auto before = locks.quietGeneration(identifier)) {
         auto live = cache.liveContainerForUser(userId, containerClass, identifier);
-        if (locks.quietGeneration() == before)
+        if (locks.quietGeneration(identifier) == before)
             return live;
     }
     cache.prepare(userId, containerClass, false);
@@ -92,7 +92,7 @@ Result<std::optional<FoundContainer>> Creation::lookedFor(const Wanted& wanted,
         needs_.cache.prepare(wanted.userId, wanted.containerClass, wanted.options.transient);
         if (wanted.options.createIfNecessary && !wanted.caller.ownsRoot())
             (void)needs_.cache.heldByUser(wanted.userId);
-        const AllIdentifiersWriteLock lock(needs_.locks);
+        const AllIdentifiersWriteLock lock(needs_.locks, Touches::nothing());
         return createOrLookup(wanted, built, lock);
     });
 }
@@ -129,6 +129,7 @@ Result<std::optional<FoundContainer>> Creation::createOrLookup(const Wanted& wan
         (*record)->setExisted(true);
         return snapshot(*record);
     }
+    lock.touch(Touches::only({identifier}));
     if (record)
         TRY(discardTransient(**record, identifier));
     else if (!record.error().is(ErrorCode::notFound))

@@ -20,7 +20,7 @@ Result<void> ContainerRemoval::stage(const ContainerToGo& container) {
         std::vector<FileURL> changed;
         needs_.cache.prepare(container.userId, container.containerClass);
         auto staged = needs_.recovery.undisturbed([&] {
-            const AllIdentifiersWriteLock lock(needs_.locks);
+            const AllIdentifiersWriteLock lock(needs_.locks, Touches::nothing());
             return stage(container, changed, lock);
         });
         return conclude(std::move(staged), std::move(changed));
@@ -43,10 +43,11 @@ Result<std::shared_ptr<ZORMetadata>> ContainerRemoval::find(const ContainerToGo&
 }
 
 Result<void> ContainerRemoval::take(const ContainerToGo& container, const ZORMetadata& record,
-                                    std::vector<FileURL>& changed, const AllIdentifiersWriteLock& /*held*/) {
+                                    std::vector<FileURL>& changed, const AllIdentifiersWriteLock& lock) {
     const Reporter report(needs_.log, function);
     const auto& [userId, uuid, identifier, containerClass] = container;
     const bool transient = record.transient();
+    lock.touch(Touches::only({record.identifier()}));
     if (!takeAway(record.url(), topLevelOwnerOf(record.containerClass(), record.uid()), changed))
         return {};
     if (isPerUserClass(containerClass) && !transient &&
@@ -141,7 +142,7 @@ Result<void> Deletion::stageForDeleteContainersWithUsers(const DeletionBatch& ba
             prepare(batch, index);
         while (progress.next < count) {
             auto staged = needs_.removal.undisturbed([&] {
-                const AllIdentifiersWriteLock lock(needs_.locks);
+                const AllIdentifiersWriteLock lock(needs_.locks, Touches::nothing());
                 return stageNext(batch, progress, lock);
             });
             if (!staged)

@@ -33,7 +33,7 @@ std::optional<std::uint64_t> keptDiskUsage(const ZORMetadata& record) {
 
 void DiskUsage::keepDiskUsage(const Caller& caller, const ContainerAddress& address, const FileURL& measured,
                               std::uint64_t bytes) {
-    const IdentifierWriteLock lock(needs_.locks, address.lockName());
+    const IdentifierWriteLock lock(needs_.locks, address.lockName(), Touches::nothing());
     const auto record = needs_.cache.containerForUser(address.userId, address.containerClass, &*address.identifier,
                                                       address.uuid->string());
     if (!record || !*record || (*record)->transient() || (*record)->url() != measured)
@@ -53,7 +53,7 @@ Result<std::uint64_t> DiskUsage::diskUsage(const Caller& caller, const Container
     FileURL container;
     fs::OpenResult directory = Errno(ENOENT);
     {
-        const IdentifierWriteLock lock(needs_.locks, address.lockName());
+        const IdentifierWriteLock lock(needs_.locks, address.lockName(), Touches::nothing());
         const auto record = TRY(knownContainer(needs_.log, needs_.cache, function, address, lock));
         isKept = isBundleClass(address.containerClass) && !record->transient();
         if (isKept)

@@ -60,7 +60,7 @@ ErrorCode EntitlementChange::processEntitlements(const plist::Dictionary* entitl
         prepare(*identifier);
         std::optional<Change> change;
         TRY(needs_.removal.undisturbed([&] {
-            const AllIdentifiersWriteLock lock(needs_.locks);
+            const AllIdentifiersWriteLock lock(needs_.locks, Touches::nothing());
             return process(entitlements, *identifier, options, change, lock);
         }));
         return change ? settle(*change) : ErrorCode::success;

@@ -52,7 +52,7 @@ Result<void> InfoValues::setInfoValue(const Caller& caller, const plist::Value* 
                                       const ContainerAddress& address) {
     return needs_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
         TRY(checkSet(key, address));
-        const IdentifierWriteLock lock(needs_.locks, address.lockName());
+        const IdentifierWriteLock lock(needs_.locks, address.lockName(), Touches::nothing());
         return set(caller, value, *key, address, lock);
     });
 }

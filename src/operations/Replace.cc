@@ -82,7 +82,7 @@ Result<void> Replace::move(const ReplaceRequest& request, Progress& progress, St
     const auto askHome = [&] { (void)needs_.configuration.homeAnswers(request.userIdNew, fs::MountFence::Asked::now); };
     askHome();
     {
-        const AllIdentifiersWriteLock lock(needs_.locks);
+        const AllIdentifiersWriteLock lock(needs_.locks, Touches::nothing());
         result = recoveringFromExceptions(progress, [&] { return begin(request, progress, lock); });
         if (progress.stale)
             return {};
@@ -99,7 +99,7 @@ Result<void> Replace::move(const ReplaceRequest& request, Progress& progress, St
         const Errno ordered =
             needs_.moves.durability().between(progress.prepared.waiting.get(), progress.directories.dest.get());
         askHome();
-        const AllIdentifiersWriteLock lock(needs_.locks);
+        const AllIdentifiersWriteLock lock(needs_.locks, progress.touches());
         result = recoveringFromExceptions(progress, [&]() -> Result<void> {
             if (ordered)
                 return undoFirstMove(progress, posixError({replaceFunction, __LINE__}, ordered, "sync of %s failed: %s",
@@ -140,6 +140,7 @@ Result<void> Replace::begin(const ReplaceRequest& request, Progress& progress, c
         progress.stale = true;
         return {};
     }
+    lock.touch(progress.touches());
     if (progress.oldRecord)
         TRY(moveOldAway(request, progress));
     return progress.stale || progress.newMovesLater ? Result<void>() : putNewInPlace(request, progress);
@@ -347,7 +348,7 @@ Result<void> Replace::prepare(const ReplaceRequest& request, Prepared& prepared,
 Result<void> Replace::writeOldUuid(Prepared& prepared) {
     ZORMetadata& record = *prepared.newRecord;
     const UUID own = record.uuid();
-    const IdentifierWriteLock lock(needs_.locks, own.string());
+    const IdentifierWriteLock lock(needs_.locks, own.string(), Touches::nothing());
     // Its own writers hold that lock, too.
     if (record.uuid() != own || record.url() != prepared.newUrl)
         return {};
@@ -441,7 +442,7 @@ void Replace::withdraw(Progress& progress) {
         return;
     // It did not take the old one's place: it is again who it was. Should that fail, the file's next writing does it.
     const ZORMetadata& record = *prepared.newRecord;
-    const IdentifierWriteLock lock(needs_.locks, record.uuid().string());
+    const IdentifierWriteLock lock(needs_.locks, record.uuid().string(), Touches::nothing());
     (void)record.writeMetadataToDiskWithError(needs_.log, needs_.fileManager);
 }
 

@@ -69,6 +69,10 @@ struct Replace::Progress {
     } directories;
 
     [[nodiscard]] bool hasMovedByJournal() const { return !waitingUrl.empty(); }
+    [[nodiscard]] Touches touches() const {
+        return oldRecord ? Touches::only({oldRecord->identifier(), newRecord->identifier()})
+                         : Touches::only({newRecord->identifier()});
+    }
 };
 
 /// In messages.

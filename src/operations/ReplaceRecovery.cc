@@ -281,13 +281,15 @@ Result<void> ReplaceRecovery::refuseIfUnderWay(std::uint32_t userId, ContainerCl
     return posixError(ZOR_HERE, Errno(EINPROGRESS), "a replace of %s is under way", ZOR_SHOWN(std::string(identifier)));
 }
 
-Result<bool> ReplaceRecovery::settleReplaces(const ContainerAtStake& atStake, const AllIdentifiersWriteLock& /*held*/) {
+Result<bool> ReplaceRecovery::settleReplaces(const ContainerAtStake& atStake, const AllIdentifiersWriteLock& lock) {
     TRY(refuseIfUnderWay(atStake.userId, atStake.containerClass, atStake.identifier));
     if (waiting_.none())
         return false;
     if (waiting_.unlisted())
         TRY(listReplacesAgain(atStake));
     bool settled = false;
+    // A replace may be of two identifiers, and all class caches are dropped.
+    lock.touch(Touches::anything());
     for (const WaitingReplaces::Waiting& one : waiting_.all()) {
         const FileURL staged = one.waitingUrl.empty() ? needs_.configuration.stagingDirectory().appendingDirectory(
                                                             ReplaceJournal::stagingNameFor(one.journalUrl))

@@ -21,7 +21,7 @@ Result<void> Structure::recreateDefaultStructureForUser(const ContainerAddress& 
         TRY(checkAddress(needs_.log, function, address));
         std::vector<FileURL> changed;
         {
-            const IdentifierWriteLock lock(needs_.locks, address.lockName());
+            const IdentifierWriteLock lock(needs_.locks, address.lockName(), Touches::nothing());
             const auto record = TRY(knownContainer(needs_.log, needs_.cache, function, address, lock));
             changed.push_back(record->url());
             TRY(makeSubdirectories(layoutOf(address.containerClass, address.userId),

@@ -149,7 +149,7 @@ Result<ZORDataProtectionChangeOperation::NeedRetry> ZORDataProtectionChangeOpera
         return NeedRetry::yes;
     TRY(walked);
     // Nothing may come between the look and the record: else what is recorded could be of a container that has gone.
-    const IdentifierWriteLock lock(needs_.locks, dataContainerMetadata_->uuid().string());
+    const IdentifierWriteLock lock(needs_.locks, dataContainerMetadata_->uuid().string(), Touches::nothing());
     TRY(checkStillThere(lock));
     const auto now = needs_.fileManager.resolver().openDirectoryPath(dataContainerMetadata_->url());
     const auto identity = now ? identityOf(now->get()) : std::nullopt;

@@ -197,7 +197,7 @@ Result<std::vector<FoundContainer>> ZORGroupManager::groupContainers(std::uint32
     const auto look = [&]() -> Result<void> {
         containers.clear();
         missing.clear();
-        const AllIdentifiersWriteLock lock(needs_.locks);
+        const AllIdentifiersWriteLock lock(needs_.locks, Touches::nothing());
         const auto groups = type == GroupType::system
                                 ? needs_.entitlements.systemGroupIdentifiersForIdentifier(identifier)
                                 : needs_.entitlements.appGroupIdentifiersForIdentifier(identifier);
@@ -263,7 +263,7 @@ Result<std::vector<std::string>> ZORGroupManager::groupContainerIdentifiersForUs
             return Reporter(needs_.log, here.function)
                 .error({ErrorCode::invalidObject, here.line}, "Can't act on an invalid object: userId: %u, ID: %s",
                        userId, "(null)");
-        const AllIdentifiersWriteLock lock(needs_.locks);
+        const AllIdentifiersWriteLock lock(needs_.locks, Touches::nothing());
         return needs_.entitlements.appGroupIdentifiersForIdentifier(*identifier).value_or(std::vector<std::string>());
     });
 }

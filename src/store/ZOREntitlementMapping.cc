@@ -132,6 +132,15 @@ std::optional<plist::Value> ZOREntitlementMapping::_onQueue_store(const std::str
     return before;
 }
 
+void ZOREntitlementMapping::_onQueue_countChange(const std::vector<std::string>& keys,
+                                                 const std::vector<std::string>& whose) {
+    // That list tells others whose children they are.
+    if (std::ranges::find(keys, entitlementMapKeys::childPluginBundleIds) != keys.end())
+        generation_.fetch_add(1, std::memory_order_acq_rel);
+    for (const std::string& identifier : whose)
+        generationOfGroup_[identifierGroupOf(identifier)].fetch_add(1, std::memory_order_acq_rel);
+}
+
 Result<std::optional<ZOREntitlementMapping::Change>>
 ZOREntitlementMapping::_onQueue_apply(const std::vector<plist::Dictionary>& values,
                                       const std::vector<std::string>& keys, const std::vector<std::string>& whose) {
@@ -140,7 +149,7 @@ ZOREntitlementMapping::_onQueue_apply(const std::vector<plist::Dictionary>& valu
         return report.error(ErrorCode::entitlementCountsDiffer,
                             "Can't act on an invalid input: values count: %ld, IDs count: %ld",
                             static_cast<long>(values.size()), static_cast<long>(keys.size()));
-    generation_.fetch_add(1, std::memory_order_acq_rel);
+    _onQueue_countChange(keys, whose);
     std::vector<std::pair<std::string, std::optional<plist::Value>>> previous;
     const Change owed = owed_;
     const Change change = applied_ + 1;

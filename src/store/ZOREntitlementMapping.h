@@ -106,9 +106,12 @@ public:
     /// message.
     [[nodiscard]] bool callerRegistrationIsDue(const std::string& identifier, const plist::Dictionary& entitlements,
                                                const plist::Dictionary& options) ZOR_EXCLUDES(entitlementQueue_);
-    /// Another one after each change of what callerRegistrationIsDue tells; never 0. An answer of it holds while the
-    /// generation is the one that was read before it was asked for. One atomic read.
-    [[nodiscard]] std::uint64_t generation() const { return generation_.load(std::memory_order_acquire); }
+    /// Another one after each change of what callerRegistrationIsDue tells of the identifier; never 0. An answer of it
+    /// holds while the generation is the one that was read before it was asked for. Two atomic reads.
+    [[nodiscard]] std::uint64_t generation(std::string_view identifier) const {
+        return generation_.load(std::memory_order_acquire) +
+               generationOfGroup_[identifierGroupOf(identifier)].load(std::memory_order_acquire);
+    }
 
     /// Stores a value under each key (an empty dictionary removes the key) and saves once, when anything changed. Error
     /// 60 when the counts differ, 59 as above.
@@ -166,6 +169,8 @@ private:
         ZOR_REQUIRES(entitlementQueue_);
     [[nodiscard]] bool _onQueue_changesNothing(const plist::Dictionary* entitlements, const std::string& identifier,
                                                const plist::Dictionary* options) const ZOR_REQUIRES(entitlementQueue_);
+    void _onQueue_countChange(const std::vector<std::string>& keys, const std::vector<std::string>& whose)
+        ZOR_REQUIRES(entitlementQueue_);
     /// `whose`: the identifiers that are told of the change.
     Result<std::optional<Change>> _onQueue_apply(const std::vector<plist::Dictionary>& values,
                                                  const std::vector<std::string>& keys,
@@ -184,8 +189,10 @@ private:
     /// The file that could not be read had its name still when that was last looked at. Set while the map is loaded.
     std::atomic<bool> fileIsUnread_{false};
     std::atomic<bool> groupIdsAreMigrated_{false};
-    /// Raised on the queue, before the map changes.
+    // Raised on the queue, before the map changes: by what may concern every identifier, and by what concerns those of
+    // one group.
     std::atomic<std::uint64_t> generation_{1};
+    std::array<std::atomic<std::uint64_t>, identifierGroupCount> generationOfGroup_{};
     /// Held while the file is written, never under the entitlement queue.
     platform::Mutex saving_;
     platform::Mutex entitlementQueue_;

@@ -175,7 +175,7 @@ TEST_F(Locks, LoadOverEveryMode) {
             const std::size_t j = random() % 4;
             const unsigned kind = random() % 4;
             if (kind == 0) {
-                const IdentifierLock one(locks, names[i], mode);
+                const IdentifierLock one(locks, names[i], mode, Touches::only({names[i]}));
                 use(i, mode);
             } else if (kind == 1) {
                 locks._lock_identifier(std::vector{names[i], names[j]}, mode);
@@ -183,11 +183,17 @@ TEST_F(Locks, LoadOverEveryMode) {
                 use(j, mode);
                 locks.unlock_identifier(std::vector{names[i], names[j]});
             } else if (kind == 2) {
-                const auto before = locks.quietGeneration();
+                const auto before = locks.quietGeneration(names[i]);
                 const bool same = guarded[i].first == guarded[i].second;
-                const bool quiet = before && locks.quietGeneration() == before;
+                const bool quiet = before && locks.quietGeneration(names[i]) == before;
                 broken += quiet && !same ? 1 : 0;
                 undisturbed += quiet ? 1 : 0;
+            } else if (mode == LockMode::writing && j > 1) {
+                const AllIdentifiersWriteLock all(locks, Touches::nothing());
+                for (const std::size_t k : {i, j}) {
+                    all.touch(Touches::only({names[k]}));
+                    use(k, mode);
+                }
             } else {
                 const AllIdentifiersLock all(locks, mode);
                 for (std::size_t k = 0; k < 4; ++k)
@@ -197,7 +203,8 @@ TEST_F(Locks, LoadOverEveryMode) {
     });
     EXPECT_EQ(broken, 0);
     EXPECT_GT(undisturbed, 0);
-    EXPECT_TRUE(locks.quietGeneration());
+    for (const std::string& name : names)
+        EXPECT_TRUE(locks.quietGeneration(name));
     EXPECT_EQ(locks.identifiersInUse(), 0U);
     EXPECT_TRUE(allIsFree());
     EXPECT_TRUE(sink.take().empty());

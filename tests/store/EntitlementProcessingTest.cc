@@ -237,7 +237,7 @@ TEST_F(Processing, ASaveHoldsOnlyItsOwnChange) {
         if (call.call != DiskCall::sync || entered.exchange(true))
             return;
         EXPECT_TRUE(mapping().entitlementsExistForIdentifier("a"));
-        EXPECT_TRUE(world.services().locks().quietGeneration());
+        EXPECT_FALSE(world.services().locks().allAreHeldForWriting());
         EXPECT_EQ(process(e, "before"), ErrorCode::success);
         again = std::async(std::launch::async, [&] { return process(e, "a"); });
         next = std::async(std::launch::async, [&] { return process(e, "b"); });

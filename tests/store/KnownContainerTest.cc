@@ -147,8 +147,9 @@ TEST_F(Known, RetryTestCountsDown) {
     }
 }
 
-// Goal: nobody waits for the disk under the lock of all identifiers. Method: whether somebody holds it at each sync
-// that an operation makes, on file systems that keep an order and on those that keep none.
+// Goal: nobody waits for the disk under the lock of all identifiers, and lookups of others not even for what is done
+// under it. Method: whether somebody holds it at each sync that an operation makes, on file systems that keep an order
+// and on those that keep none; whose lookups are told to wait at each move under it.
 TEST(Syncs, AreWaitedForWithoutTheLock) {
     using plist::Dictionary;
     const std::string id = "com.example";
@@ -181,12 +182,19 @@ TEST(Syncs, AreWaitedForWithoutTheLock) {
             world.services().cache().dropAll(); // as after a start: class directories are read, and synced
             int syncs = 0;
             int held = 0;
+            const ZORLocks& locks = world.services().locks();
             world.disk().before = [&, mine = std::this_thread::get_id()](const support::DiskCallInfo& call) {
                 const bool isSync = call.call == DiskCall::sync || call.call == DiskCall::syncFileSystem;
-                if (!isSync || std::this_thread::get_id() != mine)
+                if ((!isSync && call.call != DiskCall::rename) || std::this_thread::get_id() != mine)
                     return;
-                ++syncs;
-                held += world.services().locks().quietGeneration() ? 0 : 1;
+                syncs += isSync ? 1 : 0;
+                if (!locks.allAreHeldForWriting())
+                    return;
+                held += isSync ? 1 : 0;
+                EXPECT_TRUE(locks.quietGeneration("other")) << call.describe();
+                EXPECT_FALSE(locks.quietGeneration(id) && locks.quietGeneration("group") &&
+                             locks.quietGeneration("new"))
+                    << call.describe();
             };
             EXPECT_TRUE(operation(world));
             world.drainDeathRow(); // its thread asks the disk, too
