@@ -5,53 +5,40 @@
 # clients built against either library talk through either library to either daemon. It boots under its own systemd, where the unit's filter of system calls
 # kills at the first call that it does not let pass; where none boots, namespaces do, and a stand-in runs what the unit runs.
 # Ends with the first surprise.
-# usage: tools/package-test.sh PACKAGES WORK-FOLDER [PACKAGES-OF-AN-OLDER-VERSION]
+# usage: tools/package-test.sh PACKAGES WORK-FOLDER BARE-SYSTEM [PACKAGES-OF-AN-OLDER-VERSION]
 set -euo pipefail
 packages="$(readlink -f "${1:?folder of the packages}")"
 work="$(readlink -m "${2:?work folder}")"
-older="$(readlink -f "${3:-$packages}")"
+base="$(readlink -m "${3:?folder of the bare system}")"
+older="$(readlink -f "${4:-$packages}")"
 cd "$(dirname "$(readlink -f "${BASH_SOURCE[0]}")")/.."
-base="$work/base"
+# shellcheck source=tools/bare-system.sh
+source tools/bare-system.sh
+inOwnNamespaces tools/package-test.sh "$packages" "$work" "$base" "$older"
 root="$work/root"
-# The most that the unit may expose, in tenths, as systemd-analyze counts.
+# The most that the unit may expose, in tenths, as systemd-analyze counts; and with the drop-in for devices.
 exposureMax=24
-
-if [[ -z "${ZORVANE_PACKAGE_TEST:-}" ]]; then
-    # All that is started ends with the first process of the namespace; its mounts go with it.
-    ZORVANE_PACKAGE_TEST=1 exec unshare --mount --pid --fork --kill-child --mount-proc --propagation private \
-        tools/package-test.sh "$packages" "$work" "$older"
-fi
+exposureOfDeviceMax=20
 
 fail() {
     echo "package-test: $*" >&2
     inside 'cat /zorvaned.console; journalctl -n 30 --no-pager -u zorvaned' 2>/dev/null >&2 || true
     exit 1
 }
-say() { printf '\n== %s\n' "$*"; }
-# In the bare system, with nothing of this one's surroundings.
+# In the bare system.
 inside() {
     local enter=(chroot "$root")
     [[ -z "${first:-}" ]] || enter=(nsenter --target "$first" --mount --pid --uts --ipc)
-    "${enter[@]}" /usr/bin/env -i PATH=/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin HOME=/root \
-        DEBIAN_FRONTEND=noninteractive LC_ALL=C.UTF-8 bash -c "$1"
+    asInstalled "${enter[@]}" -- "$1"
 }
 
-if [[ ! -e "$base/usr" ]]; then
-    say "A bare Debian 12"
-    mirror="$(grep -rhoE 'https?://[^ ]*/debian/?( |$)' /etc/apt/sources.list /etc/apt/sources.list.d 2>/dev/null | head -n 1)" || true
-    rm -rf "$work/base.new"
-    mkdir -p "$work"
-    debootstrap --variant=minbase --include=systemd-sysv,dbus bookworm "$work/base.new" \
-        "${mirror:-http://deb.debian.org/debian}" >"$work/debootstrap.log" 2>&1 || fail "no bare system: $work/debootstrap.log"
-    chroot "$work/base.new" apt-get clean
-    mv "$work/base.new" "$base"
-fi
-rm -rf "$root"
-cp -a "$base" "$root"
+# exposes TENTHS: whether the unit exposes no more than that.
+exposes() { inside "systemd-analyze security --offline=true --threshold=$1 zorvaned.service >/dev/null"; }
+
+bareSystem "$base" "$root" || fail "there is no bare system"
 mkdir -p "$root/build/packages" "$root/etc/systemd/system/zorvaned.service.d"
 cp "$packages"/*.deb "$root/build/packages/"
-rm -f "$root"/build/packages/*-dbgsym_*.deb "$root/etc/resolv.conf"
-cp -L /etc/resolv.conf "$root/etc/resolv.conf"
+rm -f "$root"/build/packages/*-dbgsym_*.deb
 printf '[Service]\nSystemCallErrorNumber=\nWatchdogSec=4\n' >"$root/etc/systemd/system/zorvaned.service.d/test.conf"
 
 first=
@@ -103,24 +90,36 @@ say "The library and its Python module"
 inside 'python3 -c "import zorvane; print(zorvane.Client().status()[\"Peer\"])"' ||
     fail "a program of others does not reach the daemon"
 
-say "Every kind of work, under the unit's fences"
-inside 'set -e; ctl() { zorvanectl "$@" >/dev/null || { echo "zorvanectl $*" >&2; exit 1; }; }
-    app=(org.example.notes --class data-app --user 1000)
-    mkdir /bundle; echo code >/bundle/program; ctl install org.example.notes /bundle --class bundle-app --yes
+# everyKindOfWork USER: each command of the tool, and what it needs of the unit.
+everyKindOfWork() {
+    inside "user=$1;"'set -e; ctl() { zorvanectl "$@" >/dev/null || { echo "zorvanectl $*" >&2; exit 1; }; }
+    app=(org.example.notes --class data-app --user $user) other=(org.example.other --class data-app --user $user)
+    mkdir -p /bundle; echo code >/bundle/program; ctl install org.example.notes /bundle --class bundle-app --yes
     ctl install org.example.notes /bundle --class bundle-app --yes
     ctl entitlements set org.example.notes --app-group group.org.example --system-group systemgroup.org.example --system-container
-    ctl groups org.example.notes --user 1000; ctl why org.example.notes
-    ctl create org.example.other --class data-app --user 1000; ctl create org.example.other --class data-app --user 1000 --transient
-    ctl replace org.example.other --class data-app --user 1000 --yes; ctl wipe org.example.other --class data-app --user 1000 --yes
-    ctl info set "${app[@]:0:1}" key 1 "${app[@]:1}"; ctl protect "${app[@]:0:1}" 1 "${app[@]:1}"; ctl usage --class data-app --user 1000
-    ctl repair "${app[@]}"; ctl regenerate "${app[@]}"; ctl list --class data-app --user 1000; ctl metadata "${app[@]}"
-    ctl delete org.example.other --class data-app --user 1000 --yes; ctl empty-death-row; ctl status; ctl check' ||
-    fail "something does not work under the unit"
+    ctl groups org.example.notes --user $user; ctl why org.example.notes; ctl create "${app[@]}"
+    ctl create "${other[@]}"; ctl create "${other[@]}" --transient; ctl replace "${other[@]}" --yes; ctl wipe "${other[@]}" --yes
+    ctl info set "${app[@]:0:1}" key 1 "${app[@]:1}"; ctl protect "${app[@]:0:1}" 1 "${app[@]:1}"; ctl usage --class data-app --user $user
+    ctl repair "${app[@]}"; ctl regenerate "${app[@]}"; ctl list --class data-app --user $user; ctl metadata "${app[@]}"
+    ctl delete "${other[@]}" --yes; ctl empty-death-row; ctl status; ctl check'
+}
+say "Every kind of work, under the unit's fences"
+everyKindOfWork 1000 || fail "something does not work under the unit"
 if [[ -n "$first" ]]; then
     sleep 6 # longer than the watchdog's patience
     [[ "$(inside 'systemctl show -P NRestarts zorvaned')" == 0 ]] || fail "the daemon fell"
     [[ "$(inside 'systemctl show -P StatusText zorvaned')" == "Serving /: "* ]] || fail "the run loop does not say how it is"
-    inside "systemd-analyze security --offline=true --threshold=$exposureMax zorvaned.service >/dev/null" || fail "the unit exposes more than it did"
+    exposes "$exposureMax" || fail "the unit exposes more than it did"
+
+    say "The drop-in for devices, and a home where it lets one be"
+    dropIn=/etc/systemd/system/zorvaned.service.d/device.conf
+    inside "useradd --create-home --home-dir /private/var/bob --uid 1001 bob
+        cp /usr/share/doc/zorvaned/examples/device.conf $dropIn && systemctl daemon-reload && systemctl restart zorvaned" ||
+        fail "the daemon does not start with the drop-in"
+    exposes "$exposureOfDeviceMax" || fail "the drop-in leaves more open than it says"
+    everyKindOfWork 1001 || fail "something does not work with the drop-in"
+    [[ "$(inside 'zorvanectl lookup org.example.notes --class data-app --user 1001')" == */private/var/bob/* ]] || fail "there is no container of the second user"
+    inside "rm $dropIn; systemctl daemon-reload && systemctl restart zorvaned" || fail "the daemon does not start without the drop-in"
 fi
 
 say "A service in a sandbox that says when it is ready"
