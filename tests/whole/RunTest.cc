@@ -143,6 +143,7 @@ TEST(Run, ItsOwnContainersAndNothingElse) {
         // Ways to powers, and to what is the same in all namespaces.
         "grep -qx 'Seccomp:\t2' /proc/self/status && ! unshare -Ur true && ! cat /proc/keys",
         "test \"$(grep -c : /proc/net/dev)\" = 1 && test $(wc -l < /proc/net/unix) = 1",
+        "bash -c ': >/dev/udp/127.0.0.1/9 && : >/dev/udp/::1/9'",
         "test $(stat -f -c %c /tmp) -le 16384 && test $(stat -f -c %c /dev/shm) -le 16384",
         "test -z \"$ZORVANE_TEST_SECRET\" && test \"$LC_ALL\" = C.UTF-8",
         // The shell has the three descriptors; the fourth is what ls reads with.

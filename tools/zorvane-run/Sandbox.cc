@@ -51,10 +51,8 @@ std::vector<std::string> makerCommand(const Options& options, const PassedSocket
 
 std::vector<std::string> sandboxArguments(const Options& options, const ToldContainers& told,
                                           const Notifications& notifications, const PassedSockets& passed) {
-    std::vector<std::string> arguments = {"--unshare-pid", "--unshare-ipc", "--unshare-uts",
-                                          "--new-session", "--cap-drop",    "ALL"};
-    if (options.network == Network::none)
-        arguments.emplace_back("--unshare-net");
+    // The other namespaces are those that it is started in.
+    std::vector<std::string> arguments = {"--unshare-pid", "--new-session", "--cap-drop", "ALL"};
     for (const char* capability : {"CAP_SETUID", "CAP_SETGID", "CAP_SETPCAP"})
         append(arguments, {"--cap-add", capability});
     append(arguments, {"--bind", stagedRoot, "/", "--proc", "/proc", "--dev", "/dev"});

@@ -9,9 +9,11 @@
 #include <csignal>
 #include <cstdio>
 #include <fcntl.h>
+#include <net/if.h>
 #include <poll.h>
 #include <sched.h>
 #include <spawn.h>
+#include <sys/ioctl.h>
 #include <sys/prctl.h>
 #include <sys/signalfd.h>
 #include <sys/socket.h>
@@ -61,15 +63,34 @@ void closePassed(int count) {
         ::close(fd);
 }
 
+/// The program's namespaces that need nothing of the daemon's answer: they cost more than all its mounts. False, errno
+/// set.
+bool makeNamespaces(Network network) {
+    const bool ownNetwork = network == Network::none;
+    if (::unshare(CLONE_NEWIPC | CLONE_NEWUTS | (ownNetwork ? CLONE_NEWNET : 0)) != 0)
+        return false;
+    if (!ownNetwork)
+        return true;
+    ifreq loopback{.ifr_ifrn = {.ifrn_name = "lo"}, .ifr_ifru = {}};
+    loopback.ifr_flags = IFF_UP; // the kernel gives it its addresses then
+    const FileDescriptor socket(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+    return socket.valid() && ::ioctl(socket.get(), SIOCSIFFLAGS, &loopback) == 0;
+}
+
 /// In process 1 of the namespace: starts the maker, and waits for its end or that of the launcher. Its own end is that
 /// of all others, whatever they are doing: so it executes nothing, and nothing that it is told can delay it. Never
 /// returns.
-[[noreturn]] void keep(int launcher, InsideHandles handles, int passed, std::vector<char*>& command) {
+[[noreturn]] void keep(int launcher, InsideHandles handles, Network network, int passed, std::vector<char*>& command) {
     // By the signal also while this process is stopped, or waits for the maker's beginning; by the descriptor no end of
     // the launcher is missed.
     pollfd events[] = {{.fd = launcher, .events = POLLIN, .revents = 0}, {.fd = -1, .events = POLLIN, .revents = 0}};
     if (::prctl(PR_SET_PDEATHSIG, SIGKILL) != 0 || ::poll(events, 1, 0) != 0)
         ::_exit(exitFailure);
+    if (!makeNamespaces(network)) {
+        const std::string why = withReason("the namespaces of the sandbox cannot be made", zor::Errno::last());
+        std::fprintf(stderr, "zorvane-run: %s\n", why.c_str());
+        ::_exit(exitFailure);
+    }
     for (const int fd : {handles.program, handles.channel, handles.arguments})
         if (!keepOnExec(fd))
             ::_exit(exitFailure);
@@ -162,7 +183,7 @@ Result<Supervisor> Supervisor::begin(const Options& options, const PassedSockets
     if (made.keeper_ == 0) {
         made.arguments_.reset();
         made.channel_.reset();
-        keep(self.get(), handles, passed.count, commandPointers);
+        keep(self.get(), handles, options.network, passed.count, commandPointers);
     }
     closePassed(passed.count);
     return made;

@@ -9,8 +9,9 @@
 // does, and the kernel ends the others with it: at whatever instruction this program is killed, nothing is left. And
 // nothing is left of a program when this one ends, for process 1 is gone only after the last of them.
 //
-// The maker is started before it is known what to make: it is loaded while this program asks the daemon, and reads from
-// a pipe then. A launcher that finds that nothing may be made ends, and the maker with it.
+// The maker is started before it is known what to make: process 1 makes the namespaces for IPC, the host's name and the
+// network, and the maker is loaded in them, while this program asks the daemon; then the maker reads from a pipe. A
+// launcher that finds that nothing may be made ends, and the maker with it.
 #pragma once
 
 #include "Failure.h"
