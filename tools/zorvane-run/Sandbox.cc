@@ -55,11 +55,11 @@ std::vector<std::string> sandboxArguments(const Options& options, const ToldCont
     std::vector<std::string> arguments = {"--unshare-pid", "--new-session", "--cap-drop", "ALL"};
     for (const char* capability : {"CAP_SETUID", "CAP_SETGID", "CAP_SETPCAP"})
         append(arguments, {"--cap-add", capability});
-    append(arguments, {"--bind", stagedRoot, "/", "--proc", "/proc", "--dev", "/dev"});
+    // Each mount in it has its flags; the maker would take the devices away.
+    append(arguments, {"--dev-bind", stagedRoot, "/", "--proc", "/proc"});
     // The keys of all processes of the user, by name.
     if (::access(keysFile, F_OK) == 0)
         append(arguments, {"--ro-bind", "/dev/null", keysFile});
-    append(arguments, {"--bind", stagedMemory, memoryPlace});
     const std::vector<std::string> socket = notifications.arguments();
     arguments.insert(arguments.end(), socket.begin(), socket.end());
     std::vector<std::string> environment = sandboxEnvironment(options, told);

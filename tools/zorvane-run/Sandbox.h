@@ -3,7 +3,8 @@
 // the kernel lists keys.
 //
 // Inside there are namespaces of its own for mounts, processes, IPC, the host's name and, unless the host's is asked
-// for, the network (of which the maker makes the first two); of capabilities only those with which Inside.h gives up the rest.
+// for, the network (of which the maker makes the first two); of capabilities only those with which Inside.h gives up
+// the rest.
 #pragma once
 
 #include "Notifications.h"

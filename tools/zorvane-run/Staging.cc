@@ -5,10 +5,11 @@
 #include "platform/Errno.h"
 
 #include <cerrno>
-#include <cstring>
+#include <climits>
 #include <fcntl.h>
 #include <sched.h>
 #include <set>
+#include <string>
 #include <sys/mount.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -30,6 +31,14 @@ constexpr mode_t openMode = 0755;
 
 /// The directories that are there whatever is mounted. Programs look into the last two, and find nothing of the host's.
 constexpr const char* emptyDirectories[] = {"proc", "dev", "tmp", "run", "var"};
+
+constexpr const char* devices[] = {"null", "zero", "full", "random", "urandom", "tty"};
+constexpr struct {
+    const char* name;
+    const char* target;
+} deviceLinks[] = {{"stdin", "/proc/self/fd/0"}, {"stdout", "/proc/self/fd/1"}, {"stderr", "/proc/self/fd/2"},
+                   {"fd", "/proc/self/fd"},      {"core", "/proc/kcore"},       {"ptmx", "pts/ptmx"}};
+constexpr const char* terminalOptions = "newinstance,ptmxmode=0666,mode=620";
 
 /// A copy of the tree with everything mounted in it, and with the flags that it has in the sandbox; -1, errno set.
 FileDescriptor copyOf(const Mount& mount) {
@@ -90,6 +99,44 @@ private:
     std::set<std::string> made_;
 };
 
+/// A device of the host at a place in `directory`, /dev of the sandbox. False, errno set.
+bool placeDevice(int directory, const std::string& source, const char* name) {
+    const FileDescriptor made(::openat(directory, name, O_CREAT | O_EXCL | O_WRONLY | O_CLOEXEC, 0444));
+    const FileDescriptor tree(::open_tree(AT_FDCWD, source.c_str(), OPEN_TREE_CLONE | OPEN_TREE_CLOEXEC));
+    mount_attr attributes{};
+    attributes.attr_set = MOUNT_ATTR_NOSUID;
+    return made.valid() && tree.valid() &&
+           ::mount_setattr(tree.get(), "", AT_EMPTY_PATH, &attributes, sizeof attributes) == 0 &&
+           ::move_mount(tree.get(), "", directory, name, MOVE_MOUNT_F_EMPTY_PATH) == 0;
+}
+
+/// The simplest devices, terminals of the sandbox's own, memory to share, and the terminal that standard output is.
+/// nullptr, or the call that failed.
+const char* stageDevices() {
+    const std::string place = std::string(stagedRoot) + "/dev";
+    if (::mount("tmpfs", place.c_str(), "tmpfs", memoryFlags, "mode=0755") != 0)
+        return "mount of a tmpfs for devices";
+    const FileDescriptor directory(::open(place.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    if (!directory.valid())
+        return "open";
+    for (const char* const name : devices)
+        if (!placeDevice(directory.get(), std::string("/dev/") + name, name))
+            return "mount of a device";
+    for (const auto& link : deviceLinks)
+        if (::symlinkat(link.target, directory.get(), link.name) != 0)
+            return "symlinkat";
+    for (const char* const name : {"pts", "shm"})
+        if (::mkdirat(directory.get(), name, openMode) != 0)
+            return "mkdirat";
+    if (::mount("devpts", (place + "/pts").c_str(), "devpts", MS_NOSUID | MS_NOEXEC, terminalOptions) != 0)
+        return "mount of terminals";
+    char terminal[PATH_MAX];
+    if (::ttyname_r(STDOUT_FILENO, terminal, sizeof terminal) == 0 &&
+        !placeDevice(directory.get(), terminal, "console"))
+        return "mount of the terminal";
+    return nullptr;
+}
+
 } // namespace
 
 const char* leaveMountNamespace() {
@@ -109,7 +156,7 @@ const char* stage(const std::vector<Mount>& mounts) {
     ::umask(0);
     if (::mount("tmpfs", stagingDirectory, "tmpfs", MS_NOSUID | MS_NODEV | MS_NOEXEC, "mode=0700") != 0)
         return "mount of a tmpfs on /mnt";
-    if (::mkdir(stagedRoot, openMode) != 0 || ::mkdir(stagedMemory, openMode) != 0)
+    if (::mkdir(stagedRoot, openMode) != 0)
         return "mkdir";
     const FileDescriptor root(::open(stagedRoot, O_PATH | O_DIRECTORY | O_CLOEXEC));
     if (!root.valid())
@@ -117,14 +164,12 @@ const char* stage(const std::vector<Mount>& mounts) {
     for (const char* const name : emptyDirectories)
         if (::mkdirat(root.get(), name, openMode) != 0)
             return "mkdirat";
-    for (const std::string& place : {std::string(stagedRoot) + "/tmp", std::string(stagedMemory)})
-        if (::mount("tmpfs", place.c_str(), "tmpfs", memoryFlags, memoryOptions) != 0)
+    if (const char* const failed = stageDevices())
+        return failed;
+    for (const char* const place : {"/tmp", memoryPlace})
+        if (::mount("tmpfs", (std::string(stagedRoot) + place).c_str(), "tmpfs", memoryFlags, memoryOptions) != 0)
             return "mount of a tmpfs for what is shared in memory";
-    const FileDescriptor memory(::open(stagedMemory, O_PATH | O_DIRECTORY | O_CLOEXEC));
-    if (!memory.valid())
-        return "open";
-    Tree rootTree(root.get());
-    Tree memoryTree(memory.get());
+    Tree tree(root.get());
     for (std::size_t i = 0; i < mounts.size(); ++i) {
         const std::string& path = mounts[i].path;
         if (!mounts[i].linkTarget.empty()) {
@@ -132,10 +177,7 @@ const char* stage(const std::vector<Mount>& mounts) {
                 return "symlinkat";
             continue;
         }
-        const bool isFile = mounts[i].isFile;
-        const FileDescriptor place = isAtOrBelow(path, memoryPlace)
-                                         ? memoryTree.place(path.substr(std::strlen(memoryPlace)), isFile)
-                                         : rootTree.place(path, isFile);
+        const FileDescriptor place = tree.place(path, mounts[i].isFile);
         if (!place.valid())
             return "mkdirat";
         if (::move_mount(trees[i].get(), "", place.get(), "", MOVE_MOUNT_F_EMPTY_PATH | MOVE_MOUNT_T_EMPTY_PATH) != 0)

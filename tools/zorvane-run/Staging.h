@@ -12,11 +12,10 @@
 
 namespace zorvanerun {
 
-/// The sandbox's root, after stage(): everything but /proc and /dev, which are empty there.
+/// The sandbox's root, after stage(): everything but /proc, which is empty there.
 inline constexpr const char* stagedRoot = "/mnt/root";
 /// The sandbox's /dev/shm: memory with a bound, and the mounts whose places are in there.
 inline constexpr const char* memoryPlace = "/dev/shm";
-inline constexpr const char* stagedMemory = "/mnt/memory";
 /// The place for a socket that the program is to find.
 inline constexpr const char* stagedSocket = "/mnt/socket";
 
