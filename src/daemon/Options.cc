@@ -19,7 +19,8 @@ Keeps the containers of every application, extension and service of a device.
 
   --root DIR       work below DIR instead of / (for tests and demonstrations);
                    DIR must hold etc/passwd, the home directories named there,
-                   private/var/brevad and tmp
+                   private/var/brevad and tmp: 'zorvanectl --root DIR init'
+                   makes what is missing
   --foreground     write the log to standard error, too
   --log-level N    3 errors, 5 notable events (the default), 7 debug traces
   --forget-boot    do the work of a first launch after a boot once more
