@@ -75,7 +75,19 @@ public:
         if (!handOver())
             workOff(mine_);
     }
-    /// Returns when all is done; throws what one of the calls of `work` threw.
+    /// Returns when all that was added is done; throws what one of the calls of `work` threw. More may be added.
+    void settle() ZOR_EXCLUDES(mutex_) {
+        workOff(mine_);
+        {
+            const platform::MutexLock held(mutex_);
+            while (isHelped_ && (isHelping_ || !theirs_.empty()))
+                changed_.wait(mutex_);
+            if (theirs_.empty())
+                return;
+        }
+        finish(); // the other thread threw
+    }
+    /// The same, and nothing more is added.
     void finish() {
         workOff(mine_);
         end();
@@ -98,13 +110,24 @@ private:
             {
                 const platform::MutexLock held(mutex_);
                 isHelped_ = true;
+                isHelping_ = false;
+                changed_.signal();
                 while (theirs_.empty() && !ended_)
                     changed_.wait(mutex_);
                 if (theirs_.empty())
                     return;
                 batch.swap(theirs_);
+                isHelping_ = true;
             }
-            workOff(batch);
+            try {
+                workOff(batch);
+            } catch (...) {
+                const platform::MutexLock held(mutex_);
+                isHelped_ = false;
+                theirs_.swap(batch); // undone
+                changed_.signal();
+                throw;
+            }
         }
     }
     void workOff(std::vector<Thing>& batch) {
@@ -125,7 +148,8 @@ private:
     platform::Mutex mutex_;
     platform::ConditionVariable changed_;
     std::vector<Thing> theirs_ ZOR_GUARDED_BY(mutex_);
-    bool isHelped_ ZOR_GUARDED_BY(mutex_) = false;
+    bool isHelped_ ZOR_GUARDED_BY(mutex_) = false;  // the other thread takes batches
+    bool isHelping_ ZOR_GUARDED_BY(mutex_) = false; // and has one
     bool ended_ ZOR_GUARDED_BY(mutex_) = false;
     Helpers helpers_{1}; // ends before what it works on
 };

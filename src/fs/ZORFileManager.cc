@@ -360,22 +360,17 @@ Result<std::optional<FileDescriptor>> ZORFileManager::openForDataProtection(cons
     return posixError(ZOR_HERE, number, "Failed to open %s : %s", ZOR_SHOWN(path), number.text());
 }
 
-Result<void> ZORFileManager::setDataProtectionClassOfFile(int file, const std::string& path, int protectionClass,
-                                                          const StatusPredicate& predicate) {
+Result<void> ZORFileManager::setDataProtectionClassOfOpenItem(
+    int item, mode_t kind, const std::string& path, int protectionClass,
+    const std::function<bool(const struct stat& status, int current)>& predicate) {
     struct stat status{};
-    if (::fstat(file, &status) != 0) {
+    if (::fstat(item, &status) != 0) {
         const Errno number = platform::neverLocked(Errno::last());
         return posixError(ZOR_HERE, number, "Failed to open %s : %s", ZOR_SHOWN(path), number.text());
     }
-    if (!S_ISREG(status.st_mode))
+    if ((status.st_mode & S_IFMT) != kind)
         return {};
-    return setClassOf(file, path, protectionClass, [&](int current) { return predicate(status, current); });
-}
-
-Result<void> ZORFileManager::setDataProtectionClassOfDirectory(const fs::WalkEntry& entry, const std::string& path,
-                                                               int protectionClass, const StatusPredicate& predicate) {
-    return setClassOf(entry.directory, path, protectionClass,
-                      [&](int current) { return predicate(entry.status, current); });
+    return setClassOf(item, path, protectionClass, [&](int current) { return predicate(status, current); });
 }
 
 Result<void> ZORFileManager::setClassOf(int fd, const std::string& path, int protectionClass,

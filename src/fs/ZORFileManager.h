@@ -154,17 +154,14 @@ public:
                                                    const std::function<bool(int)>& predicate = nullptr);
     // The same for what a walk has met. The item that is opened counts, and the predicate gets its status too. `path`
     // names it in messages. EPERM means that the device is locked, and nothing else.
-    using StatusPredicate = std::function<bool(const struct stat& status, int current)>;
     /// The descriptor of a regular file whose class is to be set, O_PATH where it cannot be opened otherwise. None:
     /// what lies there cannot be such a file, or has gone.
     Result<std::optional<platform::FileDescriptor>> openForDataProtection(const fs::WalkEntry& entry,
                                                                           const std::string& path) const;
-    /// An item of another kind is left alone.
-    Result<void> setDataProtectionClassOfFile(int file, const std::string& path, int protectionClass,
-                                              const StatusPredicate& predicate);
-    /// For the end of a directory that is open.
-    Result<void> setDataProtectionClassOfDirectory(const fs::WalkEntry& entry, const std::string& path,
-                                                   int protectionClass, const StatusPredicate& predicate);
+    /// `kind` of st_mode; an item of another is left alone.
+    Result<void>
+    setDataProtectionClassOfOpenItem(int item, mode_t kind, const std::string& path, int protectionClass,
+                                     const std::function<bool(const struct stat& status, int current)>& predicate);
 
     [[nodiscard]] const fs::PathResolver& resolver() const { return resolver_; }
     /// See PathResolver::fence. Before the first use of what lies there.

@@ -229,14 +229,26 @@ Result<void> ZORDataProtectionChangeOperation::walk(int container, const std::ve
         foreignFiles_ = 0;
     }
     FirstFailure failure;
-    OpenFiles files([&](const OpenFile& file) {
+    OpenItems files([&](const OpenItem& file) {
         if (!failure.is())
             failure.note(changeFile(file));
     });
+    // A directory hands its class on to what is made in it, and comes after the files that lie in it. It waits for
+    // them with some others, so that few waits are made for the second thread.
+    std::vector<OpenItem> ended;
+    const auto changeEnded = [&] {
+        files.settle();
+        for (const OpenItem& directory : ended)
+            if (!failure.is())
+                failure.note(changeDirectory(directory));
+        ended.clear();
+    };
     for (const Item& item : items) {
         fs::TreeWalker walker(fs::WalkStatus::typeOnly);
         const Errno status = walker.walk(container, item.name.c_str(), [&](const WalkEntry& entry) {
-            failure.note(visit(entry, item, files));
+            failure.note(visit(entry, item, files, ended));
+            if (ended.size() == OpenItems::batchCount)
+                changeEnded();
             return failure.is() ? WalkStep::stop : WalkStep::proceed;
         });
         if (failure.is())
@@ -245,6 +257,7 @@ Result<void> ZORDataProtectionChangeOperation::walk(int container, const std::ve
             needs_.log.write(logLevelError, passFunction, "FTS returned error for %s : %s", item.path.c_str(),
                              status.text());
     }
+    changeEnded();
     files.finish();
     TRY(failure.take());
     saySharedFiles();
@@ -261,7 +274,8 @@ void ZORDataProtectionChangeOperation::saySharedFiles() {
                          static_cast<unsigned long long>(left), dataContainerMetadata_->url().c_str());
 }
 
-Result<void> ZORDataProtectionChangeOperation::visit(const WalkEntry& entry, const Item& item, OpenFiles& files) {
+Result<void> ZORDataProtectionChangeOperation::visit(const WalkEntry& entry, const Item& item, OpenItems& files,
+                                                     std::vector<OpenItem>& ended) {
     if (entry.onOtherFileSystem)
         return {};
     const auto path = [&] { return entry.depth == 0 ? item.path : item.path + '/' + entry.path(); };
@@ -270,8 +284,18 @@ Result<void> ZORDataProtectionChangeOperation::visit(const WalkEntry& entry, con
     case WalkEntryKind::symbolicLink:
     case WalkEntryKind::other:
         return {};
-    case WalkEntryKind::directoryEnd:
-        return (operationType_ & protectionChange::directories) != 0 ? changeDirectory(entry, path()) : Result<void>();
+    case WalkEntryKind::directoryEnd: {
+        if ((operationType_ & protectionChange::directories) == 0)
+            return {};
+        platform::FileDescriptor directory(::fcntl(entry.directory, F_DUPFD_CLOEXEC, 0));
+        if (!directory.valid()) {
+            const Errno error = Errno::last();
+            return posixError({passFunction, __LINE__}, error, "Failed to open %s : %s", ZOR_SHOWN(path()),
+                              error.text());
+        }
+        ended.push_back({.descriptor = std::move(directory), .path = path()});
+        return {};
+    }
     case WalkEntryKind::file: {
         if ((operationType_ & protectionChange::files) == 0)
             return {};
@@ -289,47 +313,39 @@ Result<void> ZORDataProtectionChangeOperation::visit(const WalkEntry& entry, con
     return {};
 }
 
-Result<void> ZORDataProtectionChangeOperation::changeDirectory(const WalkEntry& entry, const std::string& path) {
-    return setClass(
-        path, newDataProtectionClass_, [](const struct stat&, int current) { return current == untouchableClass; },
-        [&](const Declines& predicate) {
-            return needs_.fileManager.setDataProtectionClassOfDirectory(entry, path, newDataProtectionClass_,
-                                                                        predicate);
-        });
+Result<void> ZORDataProtectionChangeOperation::changeDirectory(const OpenItem& directory) {
+    return setClass(directory, S_IFDIR, newDataProtectionClass_,
+                    [](const struct stat&, int current) { return current == untouchableClass; });
 }
 
-Result<void> ZORDataProtectionChangeOperation::changeFile(const OpenFile& file) {
+Result<void> ZORDataProtectionChangeOperation::changeFile(const OpenItem& file) {
     const std::int32_t target = newDataProtectionClass_ == 0 ? classOfFilesForNone : newDataProtectionClass_;
     const bool keepLower = (operationType_ & protectionChange::keepLower) != 0;
-    return setClass(
-        file.path, target,
-        [this, target, keepLower](const struct stat& status, int current) {
-            if (isShared(status))
-                return true;
-            return current == target || current == untouchableClass || (keepLower && target > current);
-        },
-        [&](const Declines& predicate) {
-            return needs_.fileManager.setDataProtectionClassOfFile(file.descriptor.get(), file.path, target, predicate);
-        });
+    return setClass(file, S_IFREG, target, [this, target, keepLower](const struct stat& status, int current) {
+        if (isShared(status))
+            return true;
+        return current == target || current == untouchableClass || (keepLower && target > current);
+    });
 }
 
-Result<void>
-ZORDataProtectionChangeOperation::setClass(const std::string& path, std::int32_t target, const Declines& declines,
-                                           const std::function<Result<void>(const Declines& predicate)>& set) {
+Result<void> ZORDataProtectionChangeOperation::setClass(
+    const OpenItem& item, mode_t kind, std::int32_t target,
+    const std::function<bool(const struct stat& status, int current)>& declines) {
     const Reporter report(needs_.log, passFunction);
     mode_t mode = 0;
-    auto done = set([&](const struct stat& status, int current) {
-        mode = status.st_mode;
-        if (declines(status, current))
-            return false;
-        if (needs_.log.writes(logLevelDebug))
-            report.write(logLevelDebug, "Setting protection class of %s to %d", ZOR_SHOWN(path), target);
-        return true;
-    });
+    auto done = needs_.fileManager.setDataProtectionClassOfOpenItem(
+        item.descriptor.get(), kind, item.path, target, [&](const struct stat& status, int current) {
+            mode = status.st_mode;
+            if (declines(status, current))
+                return false;
+            if (needs_.log.writes(logLevelDebug))
+                report.write(logLevelDebug, "Setting protection class of %s to %d", ZOR_SHOWN(item.path), target);
+            return true;
+        });
     if (done || !done.error().isPosix(EBADF))
         return done;
     report.write(logLevelError, "Ignoring failure to set protection class to %d on %s (mode 0%o): %s", target,
-                 ZOR_SHOWN(path), mode, done.error().text().c_str());
+                 ZOR_SHOWN(item.path), mode, done.error().text().c_str());
     return {};
 }
 

@@ -10,7 +10,8 @@
 // directory which it walked lies in the container's place still, and to record the change; not in between, since every
 // lookup of any client waits for such locks. A wipe keeps path and UUID: only the directory itself tells it.
 //
-// A stop in the middle leaves some files changed and nothing recorded; the same request, sent again, does the rest.
+// A stop in the middle leaves some files changed, the directories of others not yet, and nothing recorded; the same
+// request, sent again, does the rest.
 //
 // Held by shared_ptr: a retry that waits on the lock-state queue keeps it. It runs on one thread at a time, but for the
 // files of a large tree: a second thread sets the class of some that the walk has opened.
@@ -106,19 +107,19 @@ private:
     static std::string shown(const std::vector<Item>& items);
     Result<platform::FileDescriptor> openContainer(const std::vector<Item>& items);
     Result<void> walk(int container, const std::vector<Item>& items);
-    /// A file that the walk has met: the second thread may be the one that changes it.
-    struct OpenFile {
+    /// A file or directory that the walk has met: the second thread may be the one that changes a file.
+    struct OpenItem {
         platform::FileDescriptor descriptor;
         std::string path;
     };
-    using OpenFiles = fs::HandedOn<OpenFile>;
-    Result<void> visit(const fs::WalkEntry& entry, const Item& item, OpenFiles& files);
-    Result<void> changeDirectory(const fs::WalkEntry& entry, const std::string& path);
-    Result<void> changeFile(const OpenFile& file) ZOR_EXCLUDES(sharedMutex_);
-    using Declines = ZORFileManager::StatusPredicate;
-    /// `set` sets the class of what it is given a predicate for.
-    Result<void> setClass(const std::string& path, std::int32_t target, const Declines& declines,
-                          const std::function<Result<void>(const Declines&)>& set);
+    using OpenItems = fs::HandedOn<OpenItem>;
+    /// Directories whose end was met come to `ended`.
+    Result<void> visit(const fs::WalkEntry& entry, const Item& item, OpenItems& files, std::vector<OpenItem>& ended);
+    Result<void> changeDirectory(const OpenItem& directory);
+    Result<void> changeFile(const OpenItem& file) ZOR_EXCLUDES(sharedMutex_);
+    /// `kind` of st_mode; an item of another is left alone.
+    Result<void> setClass(const OpenItem& item, mode_t kind, std::int32_t target,
+                          const std::function<bool(const struct stat& status, int current)>& declines);
     /// Whether a file, met under one of its names, may be somebody else's too. Either thread.
     [[nodiscard]] bool isShared(const struct stat& status) ZOR_EXCLUDES(sharedMutex_);
     void saySharedFiles() ZOR_EXCLUDES(sharedMutex_);

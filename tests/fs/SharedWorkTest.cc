@@ -60,8 +60,8 @@ TEST(SharedWork, HasThreadsWhereTheyPay) {
     }
 }
 
-// Goal: of things that are handed on each is done once and on two threads, and what either thread throws comes out.
-// Method: a table of who throws.
+// Goal: of things that are handed on each is done once and on two threads, all of them at a settlement, and what either
+// thread throws comes out. Method: a table of who throws.
 TEST(SharedWork, HandsOnWhatIsFound) {
     enum class Throws { nobody, finder, helper };
     constexpr int count = 2000;
@@ -80,8 +80,13 @@ TEST(SharedWork, HandsOnWhatIsFound) {
         bool thrown = false;
         try {
             HandedOn<int> things(work);
-            for (int i = 0; i < count; ++i)
+            for (int i = 0; i < count; ++i) {
                 things.add(i);
+                if (i % 100 != 99)
+                    continue;
+                things.settle();
+                EXPECT_EQ(done, i + 1);
+            }
             things.finish();
         } catch (const std::runtime_error&) {
             thrown = true;

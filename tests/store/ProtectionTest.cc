@@ -310,13 +310,17 @@ TEST_F(Protection, HostileOwner) {
     EXPECT_FALSE(world.exists(path + "tmp")); // an item that is missing is not made
 }
 
-// Goal: a tree that two threads share is changed to its last file, and a failure or a lock in its middle is the
-// change's. Method: many files; the disk refuses one, then the device locks.
+// Goal: a tree that two threads share is changed to its last file, a directory after its files, and a failure or a lock
+// in its middle is the change's. Method: many files; the disk refuses one, then the device locks; a look at the files
+// whenever a directory's turn comes.
 TEST_F(Protection, TwoThreadsShareALargeTree) {
     constexpr int count = 1000;
+    const auto nameOfFile = [](int i) {
+        return "Documents/" + (i % 10 == 0 ? "below/" : i % 2 == 0 ? std::string("many/") : "") + std::to_string(i);
+    };
     const auto isSet = [](const support::DiskCallInfo& info) { return info.call == support::DiskCall::setAttribute; };
     for (int i = 0; i < count; ++i)
-        world.write(path + "Documents/" + std::to_string(i), "x");
+        world.write(path + nameOfFile(i), "x");
     world.disk().arm({.point = 500, .error = EACCES, .filter = isSet});
     EXPECT_EQ(change(to(1)), static_cast<std::uint64_t>(EACCES));
     world.disk().arm({.filter = [&, sets = 0](const auto& info) mutable {
@@ -327,9 +331,23 @@ TEST_F(Protection, TwoThreadsShareALargeTree) {
     EXPECT_EQ(change(to(1)), 61U);
     world.disk().disarm();
     world.lockState.state = 0;
+    EXPECT_NE(classOf(path + "Documents"), 1);
+    int directories = 0;
+    world.disk().before = [&](const support::DiskCallInfo& call) {
+        const std::filesystem::path changed = "/proc/self/fd/" + std::to_string(call.fd);
+        if (!isSet(call) || !std::filesystem::is_directory(changed))
+            return;
+        ++directories;
+        const std::string below = std::filesystem::read_symlink(changed).string() + "/";
+        for (int i = 0; i < count; ++i)
+            EXPECT_TRUE(!world.path(path + nameOfFile(i)).starts_with(below) || classOf(path + nameOfFile(i)) == 1)
+                << i;
+    };
     EXPECT_EQ(change(to(1)), 1U);
+    world.disk().before = nullptr;
+    EXPECT_GT(directories, 5);
     for (int i = 0; i < count; ++i)
-        ASSERT_EQ(classOf(path + "Documents/" + std::to_string(i)), 1) << i;
+        ASSERT_EQ(classOf(path + nameOfFile(i)), 1) << i;
 }
 
 // Goal: a forbidden open is the change's error; taken for a lock it would be tried again for ever. Method: a listener
