@@ -116,7 +116,7 @@ Result<void> ReplaceRecovery::_recoverFromReplaceOperationsWithError() {
     for (const FileURL& item : *items) {
         if (!needs_.report.goOn())
             return {};
-        auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(needs_.log, needs_.fileManager, item);
+        const auto journal = readJournal(item);
         // It stays, with what it names in staging; the others do not hang on it.
         const bool unreadable = !journal && ReplaceJournal::mayStillBeRead(journal.error());
         if (unreadable)
@@ -170,12 +170,18 @@ std::size_t ReplaceRecovery::journalCount() {
     return items ? items->size() : 0;
 }
 
-Result<void> ReplaceRecovery::recoverReplace(const FileURL& journalUrl, ReplaceJournal* journal) {
+Result<ReplaceJournal> ReplaceRecovery::readJournal(const FileURL& url) {
+    auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(needs_.log, needs_.fileManager, url);
+    if (journal)
+        journal->moveToRoot(needs_.fileManager.resolver().root().canonicalPath(),
+                            needs_.configuration.stagingDirectory());
+    return journal;
+}
+
+Result<void> ReplaceRecovery::recoverReplace(const FileURL& journalUrl, const ReplaceJournal* journal) {
     const Log& log = needs_.log;
     const Reporter report(log, recoverFunction);
     if (journal) {
-        journal->moveToRoot(needs_.fileManager.resolver().root().canonicalPath(),
-                            needs_.configuration.stagingDirectory());
         if (log.writes(logLevelDebug))
             report.write(logLevelDebug, "Doing a replace of %s with info: %s", journalUrl.c_str(),
                          journal->text().c_str());
@@ -296,9 +302,9 @@ Result<bool> ReplaceRecovery::settleReplaces(const ContainerAtStake& atStake, co
                                                       : one.waitingUrl;
         if (!mayComeBack(staged, one, atStake))
             continue;
-        auto journal = ReplaceJournal::_readAndValidateReplaceFileAtUrl(needs_.log, needs_.fileManager, one.journalUrl);
+        const auto journal = readJournal(one.journalUrl);
         if (!journal && ReplaceJournal::mayStillBeRead(journal.error()))
-            return std::move(journal).error();
+            return journal.error();
         const auto recovered = recoverReplace(one.journalUrl, journal ? &*journal : nullptr);
         // The container that came back is not in the cache; also a try that failed may have brought it back, and only
         // not rid the journal.

@@ -105,8 +105,10 @@ private:
     Result<void> listReplacesAgain(const ContainerAtStake& atStake);
     /// Whether what waits at `staged` may be one of this identifier, or come back to this place.
     bool mayComeBack(const FileURL& staged, const WaitingReplaces::Waiting& waiting, const ContainerAtStake& atStake);
+    /// The places that it names are below the root as it is, wherever that was when the journal was written.
+    Result<ReplaceJournal> readJournal(const FileURL& url);
     /// `journal` is nullptr for a file that is none.
-    Result<void> recoverReplace(const FileURL& journalUrl, ReplaceJournal* journal);
+    Result<void> recoverReplace(const FileURL& journalUrl, const ReplaceJournal* journal);
     Result<void> applyReplaceJournal(const ReplaceJournal& journal);
 
     const Needs needs_;

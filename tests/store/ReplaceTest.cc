@@ -98,6 +98,10 @@ TEST_F(Replace, RefusesBeforeAnythingMoves) {
     (void)make("b", false);
     const FoundContainer freshOther = make("b", asTransient);
     const FoundContainer wellKnown = world.make("com.veltra.settingsd", ContainerClass::dataSystem);
+    // Something has the name that the third would get.
+    const FoundContainer third = make("c", false);
+    const FoundContainer taken = make("c", asTransient);
+    world.makeDirectories(applications + "/" + nameOf(taken.path), mobile);
     using enum ErrorCode;
     const std::pair<Result<void>, ErrorCode> rows[] = {
         {world.replace(nullptr, fresh, Preserve::yes), invalidObject},
@@ -107,6 +111,7 @@ TEST_F(Replace, RefusesBeforeAnythingMoves) {
         {world.replace(nullptr, fresh), alreadyExists},
         // The new one's identifier has another live container: two of one identifier must not come to be.
         {world.replace(&old, freshOther), alreadyExists},
+        {world.replace(&third, taken), alreadyExists},
     };
     for (const auto& [answer, code] : rows)
         EXPECT_EQ(codeOf(answer), code) << &code - &rows[0].second;
@@ -123,14 +128,14 @@ TEST_F(Replace, EveryStateOfTheTableIsRecovered) {
     struct Row {
         const char* said;
         std::vector<std::string> there; // each holds a file that says where it was put
-        std::array<std::string, 4> paths;
+        std::array<std::string, 5> paths;
         std::map<std::string, std::string> after; // place to what it must hold
         bool waits = false;
     };
-    const std::array<std::string, 4> paths = {old, fresh, waiting, dest};
-    const std::array<std::string, 4> preserving = {old, fresh, waiting, old};
-    const std::array<std::string, 4> behindLink = {applications + "/loop/x", fresh, waiting, dest};
-    const std::array<std::string, 4> movedRoot = {"/elsewhere/" + old, "/elsewhere/" + old + "x",
+    const std::array<std::string, 5> paths = {old, fresh, waiting, dest};
+    const std::array<std::string, 5> preserving = {old, fresh, waiting, old};
+    const std::array<std::string, 5> behindLink = {applications + "/loop/x", fresh, waiting, dest};
+    const std::array<std::string, 5> movedRoot = {"/elsewhere/" + old, "/elsewhere/" + old + "x",
                                                   "/elsewhere/" + waiting, "/elsewhere/" + old};
     const Row rows[] = {
         {": nothing had moved", {old, fresh}, paths, {{old, old}, {fresh, fresh}}},
@@ -215,6 +220,43 @@ TEST_F(Replace, ARecoveryThatStopsKeepsWhatItStillNeeds) {
     EXPECT_EQ(world.names(journals), journalFile);
     world.launch();
     EXPECT_TRUE(isQuiet());
+}
+
+// Goal: old ones that wait in a home are not forgotten while the home is away, and come back with it, also below a root
+// that has another name. Method: two journals; launches without the home, with it, or requests then.
+TEST_F(Replace, AHomeThatIsAwayHasNotGone) {
+    const std::string home = "private/var/mobile";
+    const std::string outer = home + "/" + fs::deathRowOuter;
+    const std::string inner = outer + "/" + fs::asideInner;
+    const std::map<std::string, std::string> places = {{journal, oldPlace}, {nameOf(oldPlace), destination}};
+    for (const bool byLaunch : {false, true}) {
+        SCOPED_TRACE(byLaunch);
+        world.makeDirectories(applications, mobile);
+        world.makeDirectories(outer, ::geteuid(), 0700);
+        world.makeDirectories(inner, ::geteuid(), 0700);
+        for (const auto& [uuid, place] : places) {
+            const std::string there = inner + "/" + uuid;
+            world.putContainer(there, metadataOf(2, mobile, uuid, uuid));
+            const std::string was = "/elsewhere/";
+            world.putJournal(uuid,
+                             {was + place, was + newPlace, was + staging + "/" + uuid, was + place + "x", was + there});
+        }
+        world.move(home, "away");
+        world.relaunch();
+        world.relaunch();
+        EXPECT_EQ(world.names(journals).size(), 2U);
+        world.move("away", home);
+        if (byLaunch)
+            world.relaunch();
+        for (const auto& [uuid, place] : places) {
+            const auto found = world.create(uuid);
+            ASSERT_TRUE(found);
+            EXPECT_TRUE(found->existed && found->path == world.path(place)) << found->path;
+            EXPECT_EQ(world.stage(*found), ErrorCode::success);
+        }
+        EXPECT_TRUE(isQuiet());
+        world.drainDeathRow();
+    }
 }
 
 // Goal: a change of either container while a replace is prepared is not lost, and the journal names what moves. Method:

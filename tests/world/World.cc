@@ -113,9 +113,9 @@ void World::putContainer(std::string_view relative, const plist::Dictionary& met
         require(::chown(path(relative).c_str(), owner, owner) == 0, "chown");
 }
 
-void World::putJournal(const std::string& name, const std::array<std::string, 4>& places) const {
-    const std::array<const char*, 4> keys = {"ZORReplaceOperationOldURL", "ZORReplaceOperationNewURL",
-                                             "ZORReplaceOperationStagingURL", "ZORReplaceOperationDestURL"};
+void World::putJournal(const std::string& name, const std::array<std::string, 5>& places) const {
+    const std::array keys = {"ZORReplaceOperationOldURL", "ZORReplaceOperationNewURL", "ZORReplaceOperationStagingURL",
+                             "ZORReplaceOperationDestURL", "ZORReplaceOperationAsideURL"};
     plist::Dictionary content;
     for (std::size_t i = 0; i < keys.size(); ++i)
         if (!places[i].empty())

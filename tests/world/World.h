@@ -243,8 +243,8 @@ public:
     /// A container as an earlier launch left it: `relative` is its directory, made with its parents.
     void putContainer(std::string_view relative, const plist::Dictionary& metadata) const;
 
-    /// A journal as a launch may find it: old, new, staging and destination; empty ones are left out.
-    void putJournal(const std::string& name, const std::array<std::string, 4>& places) const;
+    /// A journal as a launch may find it: old, new, staging and destination, perhaps aside; empty ones are left out.
+    void putJournal(const std::string& name, const std::array<std::string, 5>& places) const;
 
     support::RecordingLog log;
     support::SettableBuild internalBuild;
