@@ -135,6 +135,25 @@ Scenario replacement(const std::string& name, OldOne kind, bool exchanges = true
     return scenario;
 }
 
+/// The new one is deleted when it has the old one's place and the old one's file system has forgotten that: neither
+/// comes back, nor a journal that nothing can be found for.
+Scenario replacementAndDeletion() {
+    Scenario scenario = replacement("replace and deletion", OldOne::replaced, false);
+    scenario.act = [replace = scenario.act](Device& device) {
+        replace(device);
+        ZORClientConnection& client = device.client();
+        device.acted = std::exchange(device.acted, false) && device.daemon->world.pass() == ErrorCode::success &&
+                       client.deleteContainerForUser(mobileUser, &changed.identifier, changed.containerClass, false) &&
+                       device.daemon->lookUp(changed).code == ErrorCode::notFound &&
+                       device.daemon->world.pass() == ErrorCode::success;
+    };
+    scenario.afterOneError = nullptr;
+    scenario.also = [](const std::string& root, bool acted) -> std::string {
+        return acted && look(root).content != "missing" ? "a container came back" : "";
+    };
+    return scenario;
+}
+
 /// The old container waits in staging, the new one is where it was made, and their journal is on the disk.
 struct StoppedReplace {
     FileURL newUrl;
@@ -282,6 +301,7 @@ std::vector<Scenario> changeScenarios() {
     const std::string keeping = "replace that keeps the UUID";
     return {atHome(replacement(replace, OldOne::replaced)),
             atHome(replacement(replace + " without exchange", OldOne::replaced, false)),
+            atHome(replacementAndDeletion()),
             replacement(keeping, OldOne::replacedAndUuidKept),
             replacement("replace of nothing", OldOne::none),
             atHome(recovery(replace, OldOne::replaced)),

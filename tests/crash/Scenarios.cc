@@ -131,7 +131,16 @@ std::string judgeEntitlements(const std::string& root, bool acted) {
 
 Scenario entitlementFile() {
     Scenario scenario = scenarioOf(
-        "entitlement file", [](Device& device) { must(saveGroup(device, "group.old"), "the first save failed"); },
+        "entitlement file",
+        [](Device& device) {
+            must(saveGroup(device, "group.gone"), "the first save failed");
+            // A launch without a boot makes the directories that it lies in: it finds nothing for which it would sync
+            // all.
+            const FileURL library = device.daemon->world.services().configuration().libraryDirectory();
+            must(device.client()._moveItemAtURLToDeathRow(library, StartDeletionThread::yes).has_value(), "it stays");
+            device.restart(*device.disk);
+            must(saveGroup(device, "group.old"), "the second save failed");
+        },
         [](Device& device) { device.acted = saveGroup(device, "group.new"); },
         {{"com.example.new", ContainerClass::dataApplication, mobileUser}});
     scenario.also = judgeEntitlements;

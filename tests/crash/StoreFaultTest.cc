@@ -209,8 +209,9 @@ TEST_P(HomePowerCutTest, StandsEveryCutBetweenFileSystems) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Store, StorePowerCutTest, ::testing::ValuesIn(allScenarios()), scenarioName);
-INSTANTIATE_TEST_SUITE_P(Home, HomePowerCutTest,
-                         ::testing::ValuesIn(homeScenarios({"replace", "replace without exchange"})), scenarioName);
+INSTANTIATE_TEST_SUITE_P(
+    Home, HomePowerCutTest,
+    ::testing::ValuesIn(homeScenarios({"replace", "replace without exchange", "replace and deletion"})), scenarioName);
 
 } // namespace
 } // namespace zor::support

@@ -390,6 +390,8 @@ TEST_F(DeathRow, AnothersDirectoryInAContainersPlace) {
             const std::string& place = container.path;
             world.makeDirectories("precious", 0, 0700);
             world.makeDirectories("precious/file");
+            const std::string metadata = std::string("/") + names::metadataFile;
+            world.write("precious" + metadata, world.read(world.relative(place) + metadata)); // it may be taken for it
             bool swapped = false;
             const auto swap = [&](const DiskCallInfo& call) {
                 if (!swapped && call.call == DiskCall::rename && call.subject.starts_with(nameOf(place))) {
@@ -401,6 +403,8 @@ TEST_F(DeathRow, AnothersDirectoryInAContainersPlace) {
             };
             // A pass waits for the judgement of what comes to death row.
             world.disk().before = [&](const DiskCallInfo& call) {
+                // One that lies there before is not moved at all: a stop then would leave it to a pass.
+                EXPECT_TRUE(meanwhile || call.call != DiskCall::rename || !call.subject.starts_with(nameOf(place)));
                 if (!meanwhile || call.call != DiskCall::rename || !call.subject.ends_with(" -> " + nameOf(place)))
                     return;
                 world.daemonsClient().deleteContainersOnDeathRowWithCompletion(nullptr);
