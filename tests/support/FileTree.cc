@@ -10,6 +10,7 @@
 #include <filesystem>
 #include <ftw.h>
 #include <functional>
+#include <string_view>
 #include <sys/xattr.h>
 #include <unistd.h>
 
@@ -219,6 +220,15 @@ void materialise(const FileTree& tree, const std::string& directory) {
             checked(::fchmodat(root.get(), path.c_str(), inode.mode & 07777, 0), "chmod " + path);
     }
 }
+
+namespace {
+/// The daemon's platform starts its own program once, only to see that it does, and kills it: a test program would have
+/// begun its tests by then, and leave their directories.
+[[gnu::constructor]] void endTrial(int count, char** arguments) {
+    if (count == 2 && std::string_view(arguments[1]) == "--version")
+        ::_exit(0);
+}
+} // namespace
 
 TemporaryDirectory::TemporaryDirectory(const std::string& parent) : path_(parent + "/zorvane-test.XXXXXX") {
     checked(::mkdtemp(path_.data()) == nullptr ? -1 : 0, "mkdtemp in " + parent);
