@@ -149,6 +149,8 @@ int infoList(const zorvane::ConnectOptions& connect, const Output& output, const
             output.json({{"identifier", address.identifier}, {"info", toJson({found->info})}});
             return exitDone;
         }
+        if (found->info.empty())
+            output.remark(target.identifier + " has no info values");
         for (const auto& [key, value] : found->info)
             output.tree(key, value);
         return exitDone;
