@@ -72,6 +72,7 @@ LogRequestScope::~LogRequestScope() {
 
 bool isClientsMistake(ErrorCode code) {
     switch (code) {
+    case ErrorCode::success:
     case ErrorCode::invalidObject:
     case ErrorCode::identifierMissing:
     case ErrorCode::notFound:

@@ -141,6 +141,11 @@ std::unique_ptr<ZORPerUserConfiguration> ZORPerUserConfiguration::initWithUserId
     }
     std::unique_ptr<ZORPerUserConfiguration> made(new ZORPerUserConfiguration(userId, log, fileManager, *home));
     const auto seen = home->look();
+    // A healthy start says both for every user of the range, at the level of an error; in the system's journal they are
+    // none.
+    std::optional<LogCodeScope> healthy;
+    if (seen.state != UserHome::State::unknown)
+        healthy.emplace(seen.directory ? ErrorCode::success : ErrorCode::notFound);
     if (seen.state == UserHome::State::noAccount || seen.state == UserHome::State::unknown)
         log.write(logLevelError, __func__, "Failed to getpwuid for uid: %u", userId);
     log.write(logLevelError, __func__, "user home Dir: %s", seen.directory ? seen.directory->c_str() : "(null)");
