@@ -156,22 +156,6 @@ TEST_F(FileManager, RefusesWhatStandsInThePlace) {
     EXPECT_FALSE(std::filesystem::exists(elsewhere.path()));
 }
 
-// Goal: an item that cannot be examined neither exists nor does not exist. Method: each kind of item against both
-// questions; those about the last two say why they have no answer.
-TEST_F(FileManager, Existence) {
-    makeItems({"f", "dangling -> nowhere", "toRoot -> ."});
-    const std::tuple<const char*, bool, bool> rows[] = {{"f", true, false},
-                                                        {"dangling", true, false},
-                                                        {"missing/b", false, true},
-                                                        {"f/below", false, false},
-                                                        {"toRoot/f", false, false}};
-    for (const auto& [name, exists, doesNotExist] : rows) {
-        EXPECT_EQ(manager().itemExistsAtURL(url(name)), exists) << name;
-        EXPECT_EQ(manager().itemDoesNotExistAtURL(url(name)), doesNotExist) << name;
-    }
-    EXPECT_EQ(lines.take().size(), 4U);
-}
-
 // Goal: a directory is made with its class, the class changes exactly when the predicate says so and the device allows
 // it, and never through a link. Method: each of these, and a file system without classes.
 TEST_F(FileManager, SetsProtectionClasses) {

@@ -176,8 +176,7 @@ TEST(RotatingLog, WritesToStandardErrorWithoutWaitingForever) {
 TEST(Journal, TellsErrorsFromWhatClientsDoWrong) {
     const TestRoot root;
     const FileDescriptor listening(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
-    const sockaddr_un address = support::addressOf(root.path("journal"));
-    ASSERT_EQ(::bind(listening.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    ASSERT_TRUE(support::bindTo(listening.get(), root.path("journal")));
     int ends[2];
     ASSERT_EQ(::pipe2(ends, O_CLOEXEC | O_NONBLOCK), 0);
     const FileDescriptor reading(ends[0]);

@@ -1,11 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 #include "os/RunLoop.h"
 #include "os/SerialWorkQueue.h"
-#include "os/ServiceManager.h"
-#include "support/Frames.h"
-#include "support/TestRoot.h"
 #include "support/Waiting.h"
 
+#include <algorithm>
 #include <atomic>
 #include <gtest/gtest.h>
 #include <sys/eventfd.h>
@@ -15,7 +13,6 @@ namespace {
 
 using support::eventually;
 using support::inThreads;
-using support::TestRoot;
 
 // Jobs run one at a time, in order, whichever thread queues them.
 TEST(SerialWorkQueue, RunsOneAtATimeInOrder) {
@@ -84,22 +81,6 @@ TEST(RunLoop, CallsOnlyWhatIsStillWatched) {
     ASSERT_EQ(calls.size(), 1U);
     EXPECT_TRUE(calls.front() == "first" || calls.front() == "second");
     EXPECT_FALSE(loop.watch(-1, [] {}));
-}
-
-TEST(NotifySocket, SendsOneDatagram) {
-    const TestRoot test;
-    const FileDescriptor socket(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
-    const sockaddr_un address = support::addressOf(test.path("notify"));
-    ASSERT_EQ(::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
-    const std::pair<std::string, int> rows[] = {{test.path("notify"), 0},
-                                                {"", 0},
-                                                {test.path("absent"), ENOENT},
-                                                {"relative", EINVAL},
-                                                {"/" + std::string(200, 'x'), EINVAL}};
-    for (const auto& [path, result] : rows)
-        EXPECT_EQ(NotifySocket(path).send("READY=1").number(), result) << path;
-    char buffer[64];
-    EXPECT_EQ(::recv(socket.get(), buffer, sizeof buffer, MSG_DONTWAIT), 7);
 }
 
 } // namespace

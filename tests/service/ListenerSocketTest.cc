@@ -198,8 +198,7 @@ class EarlyClients {
 public:
     explicit EarlyClients(std::size_t count) {
         // Not as the listener makes one: the kernel would refuse what is passed along.
-        const sockaddr_un address = addressOf(directory.socketPath());
-        EXPECT_EQ(::bind(listening.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+        EXPECT_TRUE(bindTo(listening.get(), directory.socketPath()));
         EXPECT_EQ(::listen(listening.get(), 16), 0);
         while (clients.size() < count) {
             clients.emplace_back(directory.socketPath());

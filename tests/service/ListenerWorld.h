@@ -24,6 +24,7 @@
 namespace zor::platform {
 
 using support::addressOf;
+using support::bindTo;
 using support::connectTo;
 using support::eventually;
 using support::frameOf;

@@ -27,9 +27,8 @@ public:
         std::filesystem::create_directories(directory);
         // The path may be longer than an address.
         const platform::FileDescriptor opened = openDirectory(directory);
-        const sockaddr_un address =
-            addressOf("/proc/self/fd/" + std::to_string(opened.get()) + "/" + std::string(ipc::serviceName));
-        checked(::bind(listening_.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), "bind");
+        const std::string path = "/proc/self/fd/" + std::to_string(opened.get()) + "/";
+        checked(bindTo(listening_.get(), path + std::string(ipc::serviceName)) ? 0 : -1, "bind");
         checked(::listen(listening_.get(), accepts == Accepts::one ? 1 : 16), "listen");
         acceptor_ = std::thread([this, accepts] {
             std::vector<std::jthread> connections;

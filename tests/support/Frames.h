@@ -25,6 +25,11 @@ inline bool connectTo(int socket, const std::string& path) {
     return ::connect(socket, reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
 }
 
+inline bool bindTo(int socket, const std::string& path) {
+    const sockaddr_un address = addressOf(path);
+    return ::bind(socket, reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
+}
+
 /// From now on calls give up after ten seconds.
 inline void limitWaiting(int socket) {
     const timeval timeout = {.tv_sec = 10, .tv_usec = 0};

@@ -16,6 +16,7 @@
 #include <sys/resource.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
+#include <thread>
 #include <tuple>
 #include <unistd.h>
 
@@ -41,6 +42,36 @@ TEST(Life, SecondDaemonAndSigtermAndBrokenCommandLines) {
                                                                   {"--help", "", 0}};
     for (const auto& [option, value, status] : mistakes)
         EXPECT_EQ(runProgram({programPath("zorvaned"), option, value}).exitStatus, status) << option;
+}
+
+// Goal: a service manager hears what the daemon is at, that it is ready when it serves, and not before, that it lives,
+// and that it ends. Method: a manager's socket; a client that asks as soon as it is told.
+TEST(Life, TellsTheServiceManager) {
+    DaemonProcess daemon;
+    const std::string path = daemon.path("manager");
+    const platform::FileDescriptor manager(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+    ASSERT_TRUE(support::bindTo(manager.get(), path));
+    support::limitWaiting(manager.get());
+    const auto hears = [&](const std::string& begin) {
+        char text[256];
+        for (ssize_t bytes = 1; bytes > 0; bytes = ::recv(manager.get(), text, sizeof text, 0))
+            if (std::string_view(text, static_cast<std::size_t>(bytes)).starts_with(begin))
+                return std::string(text, static_cast<std::size_t>(bytes));
+        return std::string();
+    };
+    std::jthread asks([&] {
+        EXPECT_NE(hears("EXTEND_TIMEOUT_USEC="), "");
+        EXPECT_EQ(hears("READY=1"), "READY=1");
+        auto client = zorvane::Client::connect(daemon.connection());
+        EXPECT_TRUE(client && client->createOrLookup(dataContainer("org.example.told")));
+        EXPECT_NE(hears("WATCHDOG=1\nSTATUS=Serving " + daemon.root() + ": "), "");
+    });
+    daemon.start({}, [&] {
+        return ::setenv("NOTIFY_SOCKET", path.c_str(), 1) == 0 && ::setenv("WATCHDOG_USEC", "400000", 1) == 0;
+    });
+    asks.join();
+    EXPECT_EQ(daemon.terminate(), 0);
+    EXPECT_NE(hears("STOPPING=1\nSTATUS="), "");
 }
 
 // Goal: a daemon that would take its clients for other processes does not start, and says why. Method: the /proc of
@@ -228,6 +259,7 @@ TEST(Tool, ExitCodesAndOutput) {
         {{"--json", "info", "get", "a.b", "k", "--class", "data-app"}, 0, "\"deep\""},
         {{"--json", "info", "unset", "a.b", "k", "--class", "data-app"}, 0, "\"unset\""},
         {{"--json", "info", "list", "a.b", "--class", "data-app"}, 0, "\"info\": {}"},
+        {{"info", "list", "a.b", "--class", "data-app"}, 0, "a.b has no info values"},
         {{"--json", "repair", "a.b", "--class", "data-app"}, 0, "\"repaired\""},
         {{"--json", "lock-state", "1"}, 0, "\"locked\": true"},
         {{"protect", "a.b", "1", "--class", "data-app", "--no-wait"}, 0, "a.b gets class 1"},

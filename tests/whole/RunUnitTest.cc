@@ -126,9 +126,8 @@ TEST(RunInAUnit, Descriptors) {
     ZOR_NEEDS_SANDBOX();
     Launcher launcher;
     const std::string path = launcher.daemon.path("listener");
-    const sockaddr_un address = support::addressOf(path);
     const int listener = ::socket(AF_UNIX, SOCK_STREAM, 0);
-    ASSERT_EQ(::bind(listener, reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    ASSERT_TRUE(support::bindTo(listener, path));
     ASSERT_EQ(::listen(listener, 1), 0);
     const std::string fifo = launcher.daemon.path("fifo");
     ASSERT_EQ(::mkfifo(fifo.c_str(), 0666), 0);
@@ -297,8 +296,7 @@ TEST(RunInAUnit, TellsTheServiceManager) {
     Launcher launcher;
     const std::string path = launcher.daemon.path("manager");
     const platform::FileDescriptor manager(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
-    const sockaddr_un address = support::addressOf(path);
-    ASSERT_EQ(::bind(manager.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    ASSERT_TRUE(support::bindTo(manager.get(), path));
     support::limitWaiting(manager.get());
     const int yes = 1;
     ASSERT_EQ(::setsockopt(manager.get(), SOL_SOCKET, SO_PASSCRED, &yes, sizeof yes), 0);
