@@ -5,10 +5,51 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstring>
 #include <system_error>
 #include <unistd.h>
 
 namespace zor::ipc {
+
+namespace {
+
+constexpr std::uint64_t primeBits = 61;
+constexpr std::uint64_t prime = (std::uint64_t{1} << primeBits) - 1;
+/// So many bytes are a number below it.
+constexpr std::size_t bytesOfTerm = 7;
+
+/// Something below 2 to the power of 62 that leaves the same rest as the product.
+std::uint64_t product(std::uint64_t one, std::uint64_t other) {
+    __extension__ using Wide = unsigned __int128;
+    const Wide whole = static_cast<Wide>(one) * other;
+    const std::uint64_t sum =
+        (static_cast<std::uint64_t>(whole) & prime) + static_cast<std::uint64_t>(whole >> primeBits);
+    return (sum & prime) + (sum >> primeBits);
+}
+
+std::uint64_t secretNumber() {
+    const UUID random = UUID::random();
+    std::uint64_t number = 0;
+    std::memcpy(&number, random.bytes().data(), sizeof number);
+    return number & prime;
+}
+
+} // namespace
+
+std::size_t hashOfIdentifier(std::string_view identifier) noexcept {
+    // A polynomial whose terms are the identifier's, at a point that nobody knows: two of a thousand bytes meet there
+    // by a chance of one in 2 to the power of 53.
+    static const std::uint64_t point = secretNumber();
+    std::uint64_t sum = identifier.size();
+    while (!identifier.empty()) {
+        std::uint64_t term = 0;
+        const std::size_t bytes = std::min(bytesOfTerm, identifier.size());
+        std::memcpy(&term, identifier.data(), bytes);
+        sum = product(sum + term, point);
+        identifier.remove_prefix(bytes);
+    }
+    return sum;
+}
 
 bool isIdentifier(std::string_view text) {
     if (text.size() > identifierBytesMax)

@@ -26,6 +26,10 @@ inline constexpr std::size_t identifierBytesMax = 1024;
 /// At most identifierBytesMax bytes of UTF-8, and no NUL.
 [[nodiscard]] bool isIdentifier(std::string_view text);
 
+/// For tables in memory; other ones in each process. So nobody can choose identifiers that meet, and have each lookup
+/// walk past all of them.
+[[nodiscard]] std::size_t hashOfIdentifier(std::string_view identifier) noexcept;
+
 } // namespace zor::ipc
 
 namespace zor {

@@ -19,6 +19,7 @@
 #include "base/Mutex.h"
 #include "base/ZORError.h"
 #include "fs/Durability.h"
+#include "ipc/Identifiers.h"
 #include "platform/Errno.h"
 #include "store/Configuration.h"
 #include "store/ZORMetadata.h"
@@ -142,7 +143,7 @@ private:
         static std::string_view of(std::string_view identifier) noexcept { return identifier; }
         static std::string_view of(const Record& record) noexcept { return record->identifier(); }
         /// That it throws nothing has the table keep no hash beside each record.
-        std::size_t operator()(const auto& key) const noexcept { return std::hash<std::string_view>()(of(key)); }
+        std::size_t operator()(const auto& key) const noexcept { return ipc::hashOfIdentifier(of(key)); }
         bool operator()(const auto& left, const auto& right) const noexcept { return of(left) == of(right); }
     };
     struct ClassCache {
