@@ -5,6 +5,7 @@
 // The order of the members is the order in which they come into being; they go the other way round.
 #pragma once
 
+#include "daemon/Platform.h"
 #include "device/DataProtection.h"
 #include "device/DeviceQueries.h"
 #include "device/FileCrashAnnotation.h"
@@ -20,7 +21,6 @@
 #include "os/SerialWorkQueue.h"
 #include "os/ServiceManager.h"
 #include "os/SystemRoot.h"
-#include "platform/Platform.h"
 #include "service/SeqpacketUpcallPort.h"
 #include "service/ServiceListener.h"
 

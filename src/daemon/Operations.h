@@ -7,6 +7,7 @@
 
 #include "base/ZORError.h"
 #include "base/ZORLocks.h"
+#include "daemon/Platform.h"
 #include "fs/Durability.h"
 #include "fs/ZORFileManager.h"
 #include "operations/Basics.h"
@@ -27,7 +28,6 @@
 #include "operations/ZORContainerMigrator.h"
 #include "operations/ZORDataProtectionManager.h"
 #include "operations/ZORGroupManager.h"
-#include "platform/Platform.h"
 #include "store/Configuration.h"
 #include "store/SetupProgress.h"
 #include "store/ZORContainerCache.h"

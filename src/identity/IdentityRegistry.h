@@ -17,7 +17,6 @@
 #pragma once
 
 #include "base/Mutex.h"
-#include "identity/RegisteredExecutables.h"
 #include "identity/RegistryFiles.h"
 #include "identity/RegistryWatches.h"
 #include "platform/Process.h"
