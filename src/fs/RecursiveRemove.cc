@@ -1,18 +1,27 @@
 // SPDX-License-Identifier: Apache-2.0
 // The removal of a tree.
+//
+// A second thread only empties: it unlinks what is no directory in open directories that the walk has come to, and
+// looks at no error. The walk leaves those alone and reads the directory that holds them once more, when they have been
+// emptied as far as that went; what stayed, and each directory itself, it removes as any other. So what is refused,
+// repaired and told is the walk's alone, and told once; and only the walk opens anything by name.
 #include "fs/Trees.h"
 
 #include "fs/MountFences.h"
+#include "fs/SharedWork.h"
 #include "fs/TreeWalker.h"
 #include "os/FileDescriptor.h"
 #include "platform/Errno.h"
 
 #include <algorithm>
 #include <cerrno>
+#include <dirent.h>
 #include <fcntl.h>
 #include <linux/fs.h>
 #include <sys/ioctl.h>
 #include <sys/stat.h>
+#include <utility>
+#include <vector>
 
 namespace zor::fs {
 
@@ -20,6 +29,11 @@ namespace {
 
 /// How often a directory is read again because names came into it, and a root that changes its kind is tried again.
 constexpr unsigned passesMax = 64;
+
+/// A second thread is for trees of more files than these.
+constexpr std::size_t filesForOneThread = 1024;
+/// Directories that it gets at a time.
+constexpr std::size_t emptiedAtOnce = 4;
 
 /// Whether one of `unwanted` was set and all of them are cleared.
 ErrnoOr<bool> clearInodeFlags(platform::Disk& disk, int fd, int unwanted) {
@@ -42,6 +56,10 @@ private:
     WalkStep visit(const WalkEntry& entry);
     WalkStep removeFile(const WalkEntry& entry);
     WalkStep removeDirectory(const WalkEntry& entry);
+    /// Whether the walk comes to this directory later, when either thread has emptied it.
+    bool isForLater(const WalkEntry& entry);
+    bool handOn(const WalkEntry& entry);
+    void unlinkFiles(const platform::FileDescriptor& directory);
     WalkStep changed(const WalkEntry& entry, Errno error);
     WalkStep failed(const WalkEntry& entry, Errno error);
     bool makeParentMutable(const WalkEntry& entry);
@@ -54,6 +72,13 @@ private:
     Errno rootChanged_;
     /// The root is not what is to be removed.
     bool anotherMet_ = false;
+    std::size_t unlinked_ = 0;
+    /// By depth, of the directories of the current path: whether one in it has been handed on.
+    std::vector<bool> hasHandedOn_;
+    /// The walk is about to leave a directory that it comes to later.
+    bool skipped_ = false;
+    HandedOn<platform::FileDescriptor, emptiedAtOnce, emptiedAtOnce> emptied_{
+        [this](const platform::FileDescriptor& directory) { unlinkFiles(directory); }};
     /// Directories of the current path up to this depth hold something that could not be removed; -1: none does.
     long doomedDepth_ = -1;
 };
@@ -90,7 +115,10 @@ WalkStep Remover::visit(const WalkEntry& entry) {
             return WalkStep::stop;
         // The doomed names of this depth belong to a directory before this one.
         doomedDepth_ = std::min(doomedDepth_, static_cast<long>(entry.depth) - 1);
-        return WalkStep::proceed;
+        hasHandedOn_.resize(entry.depth + 1);
+        hasHandedOn_[entry.depth] = false;
+        skipped_ = isForLater(entry);
+        return skipped_ ? WalkStep::skip : WalkStep::proceed;
     case WalkEntryKind::directoryEnd:
     case WalkEntryKind::unreadableDirectory:
         return removeDirectory(entry);
@@ -103,12 +131,51 @@ WalkStep Remover::removeFile(const WalkEntry& entry) {
     Errno result = disk_.unlinkFile(entry.parent, entry.name);
     if (result == EPERM && makeParentMutable(entry))
         result = disk_.unlinkFile(entry.parent, entry.name);
-    if (!result || result == ENOENT)
+    if (!result || result == ENOENT) {
+        ++unlinked_;
         return WalkStep::proceed;
+    }
     return result == EISDIR ? changed(entry, result) : failed(entry, result);
 }
 
+bool Remover::isForLater(const WalkEntry& entry) {
+    // A directory that is read once more had some handed on, or is being filled by somebody else.
+    if (unlinked_ < filesForOneThread || callbacks_.goOn || entry.depth == 0 || entry.stack->pass() != 1)
+        return false;
+    // The directory is read again only when nothing in it has been told of yet; from then on nothing in it is, until it
+    // is read again.
+    const std::size_t above = entry.depth - 1;
+    const bool doomed = doomedDepth_ >= static_cast<long>(above);
+    if (!doomed && handOn(entry))
+        hasHandedOn_[above] = true;
+    return hasHandedOn_[above];
+}
+
+bool Remover::handOn(const WalkEntry& entry) {
+    platform::FileDescriptor directory(entry.directory < 0 ? -1 : ::fcntl(entry.directory, F_DUPFD_CLOEXEC, 0));
+    if (!directory.valid())
+        return false;
+    emptied_.add(std::move(directory));
+    return true;
+}
+
+void Remover::unlinkFiles(const platform::FileDescriptor& directory) {
+    BulkDirectoryRead::Buffer buffer;
+    BulkDirectoryRead entries(directory.get(), buffer);
+    while (const BulkDirectoryRead::Entry* entry = entries.next())
+        if (entry->type != DT_DIR && entry->type != DT_UNKNOWN)
+            (void)disk_.unlinkFile(directory.get(), entry->name);
+}
+
 WalkStep Remover::removeDirectory(const WalkEntry& entry) {
+    if (std::exchange(skipped_, false))
+        return WalkStep::proceed;
+    if (hasHandedOn_[entry.depth]) {
+        hasHandedOn_[entry.depth] = false;
+        emptied_.settle();
+        if (entry.kind == WalkEntryKind::directoryEnd)
+            return WalkStep::again;
+    }
     Errno result = disk_.removeDirectory(entry.parent, entry.name);
     if (result == EPERM && makeParentMutable(entry))
         result = disk_.removeDirectory(entry.parent, entry.name);
@@ -137,6 +204,8 @@ WalkStep Remover::changed(const WalkEntry& entry, Errno error) {
 }
 
 WalkStep Remover::failed(const WalkEntry& entry, Errno error) {
+    if (entry.depth > 0 && hasHandedOn_[entry.depth - 1])
+        return WalkStep::proceed; // the walk meets it again
     callbacks_.failed({.path = entry.path(), .error = error, .parent = entry.parent, .name = entry.name});
     struct stat status{};
     const bool repaired = statusOfName(entry.parent, entry.name, status) == ENOENT;

@@ -52,13 +52,13 @@ void forEachStretch(std::size_t count, const std::function<void(std::size_t begi
 /// Things that one thread finds, in order, and that it shares the work on with a second one: that one comes when there
 /// have been many, takes them a batch at a time, and where it has enough to do the finder does its batch itself. So no
 /// more than three batches are held. Both call `work`, at once; nothing is done in the order in which it was found.
-template <typename Thing>
+/// `thingsOfBatch`: few enough for one descriptor each, many enough to be worth a wake-up. `countForTwoThreads`: so
+/// many make a second thread worth while.
+template <typename Thing, std::size_t thingsOfBatch = 16, std::size_t countForTwoThreads = 256>
 class HandedOn {
 public:
     using Work = std::function<void(Thing&)>;
-    /// Things of one batch: few enough for one descriptor each, many enough to be worth a wake-up.
-    static constexpr std::size_t batchCount = 16;
-    static constexpr std::size_t countForTwoThreads = 256;
+    static constexpr std::size_t batchCount = thingsOfBatch;
 
     explicit HandedOn(Work work) : work_(std::move(work)) { mine_.reserve(batchCount); }
     HandedOn(const HandedOn&) = delete;

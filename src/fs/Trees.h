@@ -130,7 +130,7 @@ Errno copyContent(platform::Disk& disk, int from, int to, const ContentRules& ru
 // are added meanwhile are removed too, within a limit. Any depth and width, see fs/TreeWalker.h. Nothing outside the
 // tree is touched: the directory that holds the root only loses the root's name.
 //
-// One thread: a second one showed no gain, and would be one more way into a tree that its owner changes.
+// A second thread helps with a tree of many directories, unless `goOn` is asked: see RecursiveRemove.cc.
 //
 // An interruption leaves a smaller tree under the root's name. Nothing is synced. Any thread.
 

@@ -142,5 +142,46 @@ TEST(RemoveTree, RemovesWhatIsAddedMeanwhile) {
     EXPECT_EQ(world.damage(), "");
 }
 
+// Goal: of a large tree nothing stays but what cannot go, which is told once, on the caller's thread, whichever thread
+// came to it first. Method: directories that two threads empty, one with an immutable file, some with more below.
+TEST(RemoveTree, ASecondThreadEmptiesDirectories) {
+    if (::geteuid() != 0)
+        GTEST_SKIP() << "only root may set inode flags";
+    const TemporaryDirectory directory("/tmp");
+    const FileDescriptor root = openDirectory(directory.path());
+    makeItems(root.get(), {"tree/"});
+    for (const std::string half : {"tree/1/", "tree/2/"}) {
+        makeItems(root.get(), {half});
+        for (int i = 0; i < 1100; ++i)
+            makeItems(root.get(), {half + std::to_string(i)});
+        for (const std::string some : {"a/", "b/", "c/", "d/", "e/", "f/", "g/", "h/", "i/"})
+            makeItems(root.get(), {half + some, half + some + "slow", half + some + "below/", half + some + "below/f"});
+    }
+    if (!setFlags(root.get(), "tree/1/d/slow", FS_IMMUTABLE_FL) ||
+        !setFlags(root.get(), "tree/2/d/slow", FS_IMMUTABLE_FL))
+        GTEST_SKIP() << "no inode flags in /tmp";
+    platform::LinuxDisk linuxDisk;
+    support::FaultDisk disk(linuxDisk);
+    const auto caller = std::this_thread::get_id();
+    std::atomic<int> byAnother = 0;
+    disk.before = [&](const support::DiskCallInfo& info) {
+        byAnother += std::this_thread::get_id() == caller ? 0 : 1;
+        if (info.subject == "slow")
+            ::usleep(2000);
+    };
+    std::set<std::string> said;
+    const RemoveCallbacks callbacks = {.failed = [&](const RemoveFailure& failure) {
+        EXPECT_EQ(std::this_thread::get_id(), caller);
+        EXPECT_TRUE(said.insert(failure.path).second) << failure.path;
+    }};
+    EXPECT_FALSE(removeTree(disk, root.get(), "tree", callbacks));
+    EXPECT_GT(byAnother, 0);
+    EXPECT_EQ(said, (std::set<std::string>{"", "1", "1/d", "1/d/slow", "2", "2/d", "2/d/slow"}));
+    for (const std::string half : {"tree/1/", "tree/2/"}) {
+        EXPECT_FALSE(exists(root.get(), (half + "d/below").c_str()) || exists(root.get(), (half + "a").c_str()));
+        setFlags(root.get(), (half + "d/slow").c_str(), 0);
+    }
+}
+
 } // namespace
 } // namespace zor::fs::test
