@@ -95,12 +95,15 @@ private:
 // a handler is not running, so the pool lets another one take its place while a scope is open. On a thread that belongs
 // to no pool a scope does nothing.
 
+/// Whether the thread computes for long between its waits: a walk, or the writing of a large file.
+enum class Load { light, heavy };
+
 /// Implemented by whoever owns the thread.
 class BlockingObserver {
 public:
     virtual ~BlockingObserver() = default;
     // They do not fail: who opens a scope may have counted himself already as one that waits.
-    virtual void willBlock() noexcept = 0;
+    virtual void willBlock(Load load) noexcept = 0;
     virtual void didBlock() noexcept = 0;
 
     /// Makes `observer` (or nobody, with nullptr) the one that the scopes of this thread tell.
@@ -113,9 +116,9 @@ private:
 
 class BlockingScope {
 public:
-    BlockingScope() : observer_(BlockingObserver::ofThisThread()) {
+    explicit BlockingScope(Load load = Load::light) : observer_(BlockingObserver::ofThisThread()) {
         if (observer_)
-            observer_->willBlock();
+            observer_->willBlock(load);
     }
     ~BlockingScope() {
         if (observer_)

@@ -69,7 +69,8 @@ Result<std::uint64_t> DiskUsage::diskUsage(const Caller& caller, const Container
     }
     const auto begin = std::chrono::system_clock::now();
     const fs::Usage usage = [&] {
-        const platform::BlockingScope blocking; // a large tree must not take one of the few threads from all clients
+        const platform::BlockingScope blocking(
+            platform::Load::heavy); // a large tree must not take one of the few threads from all clients
         return needs_.fileManager.diskUsageOfDirectory(directory, container);
     }();
     const bool settled = usage.lastChange + settledTime <= begin;

@@ -318,7 +318,7 @@ bool Replace::lookAhead(const ReplaceRequest& request, Prepared& prepared) {
 Result<void> Replace::prepare(const ReplaceRequest& request, Prepared& prepared, bool mayExchange) {
     if (!lookAhead(request, prepared))
         return {};
-    const platform::BlockingScope blocking;
+    const platform::BlockingScope blocking(platform::Load::heavy); // a container may have to be copied
     const fs::PathResolver& resolver = needs_.fileManager.resolver();
     const auto old = prepared.oldRecord ? resolver.openParent(prepared.oldUrl) : Errno(ENOENT);
     const auto fresh = resolver.openParent(prepared.newUrl);

@@ -91,7 +91,8 @@ void ZORDataProtectionChangeOperation::startRetry() {
 }
 
 Result<ZORDataProtectionChangeOperation::NeedRetry> ZORDataProtectionChangeOperation::attempt() {
-    const platform::BlockingScope blocking; // a large tree must not take one of the few threads from all clients
+    const platform::BlockingScope blocking(
+        platform::Load::heavy); // a large tree must not take one of the few threads from all clients
     const NeedRetry needRetry = TRY(_runChangeOperationNeedToRetry());
     if (needRetry == NeedRetry::yes && retryIfLocked_ == RetryIfLocked::yes)
         queueRetry();

@@ -28,8 +28,15 @@ constexpr std::uint64_t oneTask = 4;
 /// The peer waits for the answer, which takes microseconds: a worker that is woken runs at once, and not when the
 /// peer that woke it has used up its time. A tenth of a round trip on one processor.
 constexpr int workerNice = -5;
+/// A worker with a heavy load comes behind those that ask and answer until its task has ended: the kernel may let it
+/// finish a long call before it is another's turn.
+constexpr int heavyNice = 5;
 /// A burst is seen in a few looks; more would be stack that is rarely used.
 constexpr std::size_t eventsPerLook = 64;
+
+bool setNiceOfThisThread(int nice) {
+    return ::setpriority(PRIO_PROCESS, 0, nice) == 0; // who 0: on Linux this thread alone
+}
 
 /// A thread that takes no signals: those belong to the main thread. False when the system gives none, or no memory.
 bool startThreadWithoutSignals(std::thread& thread, const char* name, std::function<void()> body) {
@@ -177,7 +184,7 @@ ListenerPool::Counters ListenerPool::counters() const {
 void ListenerPool::work(Worker& worker) {
     worker.threadId = ::gettid();
     // The pool serves all the same where that is not allowed.
-    (void)::setpriority(PRIO_PROCESS, static_cast<id_t>(worker.threadId), workerNice);
+    worker.isRaised = setNiceOfThisThread(workerNice);
     allowInterrupts();
     BlockingObserver::setForThisThread(&worker);
     while (!stopping_) {
@@ -195,6 +202,8 @@ void ListenerPool::runTask(Worker& worker, const Turn& turn) {
     const std::uint64_t task = (worker.state.load(std::memory_order_relaxed) & ~phaseMask) + oneTask;
     worker.state.store(task | static_cast<std::uint64_t>(Phase::working));
     turn.task->run(worker.scratch, turn.events);
+    if (std::exchange(worker.hasGivenWay, false))
+        worker.isRaised = setNiceOfThisThread(workerNice);
     const std::uint64_t last = worker.state.exchange(task | static_cast<std::uint64_t>(Phase::waiting));
     if (last == (task | static_cast<std::uint64_t>(Phase::blocked)))
         ++active_;
@@ -281,7 +290,9 @@ bool ListenerPool::parkWhileEnoughRun(Worker& worker) {
     return true;
 }
 
-void ListenerPool::Worker::willBlock() noexcept {
+void ListenerPool::Worker::willBlock(Load load) noexcept {
+    if (load == Load::heavy && isRaised && !std::exchange(hasGivenWay, true))
+        (void)setNiceOfThisThread(heavyNice);
     if (blockingDepth++ > 0)
         return;
     std::uint64_t seen = state;

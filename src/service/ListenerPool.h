@@ -89,7 +89,7 @@ private:
 
     struct Worker final : BlockingObserver {
         explicit Worker(ListenerPool& owner) : pool(owner) {}
-        void willBlock() noexcept override;
+        void willBlock(Load load) noexcept override;
         void didBlock() noexcept override;
 
         ListenerPool& pool;
@@ -101,6 +101,9 @@ private:
         std::uint64_t stateSeen = 0;
         std::chrono::nanoseconds cpuTimeSeen{0};
         unsigned blockingDepth = 0;
+        /// Whether it runs before others, and until its task ends behind them.
+        bool isRaised = false;
+        bool hasGivenWay = false;
         ListenerScratch scratch;
     };
     using Turn = ListenerTurns::Turn;

@@ -193,7 +193,7 @@ ZOREntitlementMapping::_onQueue_apply(const std::vector<plist::Dictionary>& valu
 }
 
 Result<void> ZOREntitlementMapping::save(Change change, const std::function<void()>& before) {
-    const platform::BlockingScope blocking;
+    const platform::BlockingScope blocking(platform::Load::heavy);
     const MutexLock saving(saving_);
     plist::Dictionary map;
     Change last = 0;
