@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the daemon's codes mean to people, in one table.
+// The daemon's codes in words for people, in one table.
 #include "zorvane/Error.h"
 
 #include <algorithm>

@@ -42,7 +42,7 @@ class Source:
         self.headers = re.findall(r'(?m)^#include ".*', text)
         self.lines = text.count("\n")
         code = re.sub(r"(?m)^#.*", "", code_of(text))
-        # What looks like a variable or a parameter; warnings tell of one that hides another's name.
+        # Each name that looks like a variable or a parameter; warnings tell of one that hides another's name.
         self.local = set(re.findall(r"[\w>&*] [&*]*([A-Za-z_]\w*)(?= ?[=;,:){])", code))
         # The style leaves what a namespace declares without indentation.
         self.declared = {name for line in re.findall(r"(?m)^(?!namespace|using|extern|\}|TEST)\w.*", code)

@@ -168,7 +168,7 @@ nextBoot() {
     ctl status
 }
 
-# What lies below a folder of the root, indented by depth, directories with a slash.
+# The items below a folder of the root, indented by depth, directories with a slash.
 tree() {
     (cd "$root" && find "$1" -mindepth 1 \( -type d -printf '%P/\n' \) -o -printf '%P\n') | LC_ALL=C sort |
         sed -E ':next; s|^( *)[^/ ][^/]*/([^/])|\1    \2|; t next'

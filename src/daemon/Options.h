@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the daemon is told on its command line.
+// The daemon's command line.
 #pragma once
 
 #include <cstddef>

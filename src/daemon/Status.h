@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What the status socket tells: to every peer, whom the daemon takes it for and why; to the owners of the root, also
+// The status socket's answers: it tells every peer whom the daemon takes it for and why; the owners of the root, also
 // how the daemon is doing.
 #pragma once
 

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// What a call to the container manager can fail with.
+// The errors of a call to the container manager.
 #pragma once
 
 #include <cstdint>
