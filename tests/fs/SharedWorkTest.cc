@@ -45,7 +45,8 @@ TEST(SharedWork, HasThreadsWhereTheyPay) {
         } catch (const std::runtime_error&) {
             thrown = true;
         }
-        const std::size_t most = work == Work::waits ? 16 : work == Work::hasNoMemory ? 1 : 2;
+        // Without memory a second one may get the stack of an earlier test's thread.
+        const std::size_t most = work == Work::waits ? 16 : 2;
         const bool all = std::ranges::count(done, 1) == static_cast<std::ptrdiff_t>(count);
         return thrown == (work == Work::throws) && threads.size() <= most &&
                (work != Work::waits || threads.size() > 4) && (all || work == Work::throws);
