@@ -7,8 +7,10 @@ set(CMAKE_RUNTIME_OUTPUT_DIRECTORY ${CMAKE_BINARY_DIR}/bin)
 
 add_library(zor_options INTERFACE)
 target_compile_options(zor_options INTERFACE
-    -Wall -Wextra -Wpedantic -Wshadow -Wnon-virtual-dtor -Woverloaded-virtual -Wformat=2 -Wundef
+    -Wall -Wextra -Wpedantic -Wnon-virtual-dtor -Woverloaded-virtual -Wformat=2 -Wundef
     -fno-omit-frame-pointer -fstack-protector-strong
+    # Of sources compiled together, one may hide a name that only another has; lint judges them all with this warning.
+    $<$<NOT:$<BOOL:$<TARGET_PROPERTY:UNITY_BUILD>>>:-Wshadow>
     # TRY is a statement expression; both compilers have them, and no standard form can return from the caller. This clang
     # finds a use of something deprecated inside this library's own stable_sort; gcc still says where ours do.
     $<$<CXX_COMPILER_ID:Clang>:-Wthread-safety -Wno-missing-designated-field-initializers
@@ -49,6 +51,17 @@ function(zor_use_pch target)
 endfunction()
 zor_precompile(zor_pch)
 
+# Sources that are compiled several at once take half the time. Tests always are, and the tool, whose libraries are all headers;
+# the rest of the product is where its tree is mostly built from nothing: under sanitizers and fuzzers. The other trees compile
+# each of its sources by itself, so that it includes what it needs.
+option(ZORVANE_TOGETHER "Compile the product's sources several at once too" OFF)
+function(zor_compile_together target)
+    set_target_properties(${target} PROPERTIES UNITY_BUILD ON UNITY_BUILD_BATCH_SIZE 8)
+    # gcc 12 is wrong about strings that are put together in an expression, as tests do; the clang builds have no such doubt.
+    target_compile_options(${target} PRIVATE $<$<CXX_COMPILER_ID:GNU>:-Wno-array-bounds -Wno-restrict
+        -Wno-maybe-uninitialized -Wno-stringop-overflow>)
+endfunction()
+
 # zor_library(name DIR folders... [EXCLUDE files...] LINK ... [INCLUDE folders...]): the sources of these folders, as zor_<name>.
 function(zor_library name)
     cmake_parse_arguments(ARG "" "" "DIR;EXCLUDE;LINK;INCLUDE" ${ARGN})
@@ -68,6 +81,9 @@ function(zor_library name)
         return()
     endif()
     add_library(zor_${name} STATIC ${sources})
+    if(ZORVANE_TOGETHER)
+        zor_compile_together(zor_${name})
+    endif()
     zor_use_pch(zor_${name})
     target_link_libraries(zor_${name} PUBLIC zor_options)
     target_link_libraries(zor_${name} ${ARG_LINK})
@@ -93,6 +109,9 @@ function(zor_program name)
         return()
     endif()
     add_executable(${name} ${sources})
+    if(ZORVANE_TOGETHER)
+        zor_compile_together(${name})
+    endif()
     zor_use_pch(${name})
     target_link_libraries(${name} PRIVATE zor_options ${ARG_LINK})
     # A device takes a program with its C++ runtime inside; a distribution, and a sanitizer, have a shared one. A program loads no
@@ -101,10 +120,10 @@ function(zor_program name)
         $<$<BOOL:${ZORVANE_STATIC_RUNTIME}>:-static-libstdc++;-static-libgcc>)
 endfunction()
 
-# zor_test(area [DIR dirs...] [COST seconds] LINK libs...): every tests/<area>/*.cc, or those of the folders, in one GoogleTest
+# zor_test(area [DIR dirs...] [COST seconds] [WAITING filter] LINK libs...): every tests/<area>/*.cc, or those of the folders, in one GoogleTest
 # program named zor_<area>_tests. Tests that cost more begin earlier.
 function(zor_test area)
-    cmake_parse_arguments(ARG "" "COST" "DIR;LINK" ${ARGN})
+    cmake_parse_arguments(ARG "" "COST;WAITING" "DIR;LINK" ${ARGN})
     if(NOT ARG_COST)
         set(ARG_COST 0)
     endif()
@@ -118,15 +137,19 @@ function(zor_test area)
         return()
     endif()
     add_executable(zor_${area}_tests ${sources})
-    # gcc 12 is wrong about strings that are put together in an expression, as tests do; the clang builds have no such doubt.
-    target_compile_options(zor_${area}_tests PRIVATE
-        $<$<CXX_COMPILER_ID:GNU>:-Wno-array-bounds -Wno-restrict -Wno-maybe-uninitialized -Wno-stringop-overflow>)
+    zor_compile_together(zor_${area}_tests)
     zor_use_pch(zor_${area}_tests)
     target_include_directories(zor_${area}_tests PRIVATE ${CMAKE_SOURCE_DIR}/tests)
     target_compile_definitions(zor_${area}_tests PRIVATE ZORVANE_SOURCE_DIR="${CMAKE_SOURCE_DIR}"
         ZORVANE_BINARY_DIR="${CMAKE_BINARY_DIR}")
     target_link_libraries(zor_${area}_tests PRIVATE zor_options ${ARG_LINK} GTest::gtest GTest::gtest_main)
-    gtest_discover_tests(zor_${area}_tests DISCOVERY_MODE PRE_TEST NO_PRETTY_VALUES PROPERTIES TIMEOUT 300 COST ${ARG_COST})
+    set(discovery DISCOVERY_MODE PRE_TEST NO_PRETTY_VALUES)
+    if(ARG_WAITING)
+        gtest_discover_tests(zor_${area}_tests TEST_FILTER "${ARG_WAITING}" TEST_LIST zor_${area}_waiting ${discovery}
+            PROPERTIES TIMEOUT 300 COST 500)
+    endif()
+    gtest_discover_tests(zor_${area}_tests TEST_FILTER "*-${ARG_WAITING}" ${discovery}
+        PROPERTIES TIMEOUT 300 COST ${ARG_COST})
 endfunction()
 
 # zor_fuzz(name LINK libs...): fuzz/<name>.cc as a libFuzzer program. Its seeds are the files in fuzz/seeds/<name>/.

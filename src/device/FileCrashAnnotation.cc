@@ -13,7 +13,7 @@
 namespace zor::platform {
 
 namespace {
-constexpr mode_t fileMode = 0640;
+constexpr mode_t annotationMode = 0640;
 constexpr std::size_t messageBytesMax = 1024 * 1024;
 } // namespace
 
@@ -27,7 +27,7 @@ Errno FileCrashAnnotation::replaceFile(std::string_view message) {
     const FileDescriptor directory = TRY(openBeneath(root_.descriptor(), names::logDirectory, O_RDONLY | O_DIRECTORY));
     const std::string temporary = std::string(".") + names::crashFile;
     (void)disk_.unlinkFile(directory.get(), temporary.c_str());
-    const FileDescriptor file = TRY(disk_.createFile(directory.get(), temporary.c_str(), fileMode));
+    const FileDescriptor file = TRY(disk_.createFile(directory.get(), temporary.c_str(), annotationMode));
     TRY(disk_.write(file.get(), {reinterpret_cast<const std::uint8_t*>(message.data()), message.size()}));
     TRY(disk_.sync(file.get()));
     TRY(disk_.rename(directory.get(), temporary.c_str(), directory.get(), names::crashFile, 0));

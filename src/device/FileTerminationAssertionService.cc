@@ -18,8 +18,8 @@ namespace zor::platform {
 
 namespace {
 
-constexpr mode_t directoryMode = 0755;
-constexpr mode_t fileMode = 0600;
+constexpr mode_t placeMode = 0755;
+constexpr mode_t assertionMode = 0600;
 // A launcher that looks whether there is an assertion has the lock for as long as that takes.
 constexpr int lockAttemptsMax = 200;
 constexpr std::chrono::milliseconds lockAttemptInterval{5};
@@ -88,7 +88,7 @@ Errno FileTerminationAssertionService::hold(const std::string& identifier, Termi
 
 ErrnoOr<FileDescriptor> FileTerminationAssertionService::openDirectory() {
     const char* const name = names::assertionDirectory;
-    const Errno made = disk_.makeDirectory(root_.runtimeDirectory(), name, directoryMode);
+    const Errno made = disk_.makeDirectory(root_.runtimeDirectory(), name, placeMode);
     if (made && made != EEXIST)
         return made;
     return openBeneath(root_.runtimeDirectory(), name, O_RDONLY | O_DIRECTORY);
@@ -102,7 +102,7 @@ ErrnoOr<FileDescriptor> FileTerminationAssertionService::lockFile(const std::str
     const Errno removed = disk_.unlinkFile(directory.get(), name.c_str());
     if (removed && removed != ENOENT)
         return removed;
-    FileDescriptor file = TRY(disk_.createFile(directory.get(), name.c_str(), fileMode));
+    FileDescriptor file = TRY(disk_.createFile(directory.get(), name.c_str(), assertionMode));
     Errno failure = lockWithin(file.get());
     if (!failure) {
         const std::string text = std::to_string(static_cast<unsigned>(reason));

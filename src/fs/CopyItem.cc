@@ -2,6 +2,7 @@
 // One item copied, out of a copy of a tree.
 #include "fs/Trees.h"
 
+#include "os/FileModes.h"
 #include "platform/Errno.h"
 
 #include <algorithm>
@@ -126,7 +127,6 @@ namespace {
 constexpr std::size_t bufferBytes = 128 * 1024;
 /// A call of the kernel's copy cannot be interrupted, so it is not asked for more than this at once.
 constexpr off_t kernelCopyBytesMax = 64 * 1024 * 1024;
-constexpr off_t blockBytes = 512;
 
 /// The call is not for this file or this pair of file systems; there is another way.
 bool refused(Errno error) {
@@ -147,7 +147,7 @@ Errno CopyData::copy(int from, int to, const struct stat& status) {
         // EINVAL may be about this one file.
         cloneRefused_ = cloned != EINVAL;
     }
-    if (status.st_blocks * blockBytes < status.st_size)
+    if (status.st_blocks * platform::blockBytes < status.st_size)
         return copyRuns(from, to, status.st_size);
     (void)TRY(copyRun(from, to, status.st_size));
     return Errno();

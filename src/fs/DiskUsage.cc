@@ -8,6 +8,7 @@
 #include "fs/SharedWork.h"
 #include "fs/TreeWalker.h"
 #include "os/FileDescriptor.h"
+#include "os/FileModes.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -28,8 +29,6 @@ namespace {
 
 /// A second thread costs more than it brings for a tree of fewer entries.
 constexpr std::uint64_t entriesForTwoThreads = 512;
-constexpr std::uint64_t blockBytes = 512;
-constexpr std::uint32_t xfsMagic = 0x58465342;
 
 /// The traits that the type of the tree's file system tells.
 struct FileSystemTraits {
@@ -47,7 +46,7 @@ FileSystemTraits traitsOf(int directory) {
     switch (static_cast<std::uint32_t>(status.f_type)) {
     case BTRFS_SUPER_MAGIC:
         return {.emptyDirectoryBytes = 0};
-    case xfsMagic:
+    case XFS_SUPER_MAGIC:
         return {.emptyDirectoryBytes = 10, .hasSubvolumes = false};
     case TMPFS_MAGIC:
         return {.emptyDirectoryBytes = 40, .hasSubvolumes = false};
@@ -211,7 +210,7 @@ template <typename MakePath>
 void Measurement::addNonDirectory(const struct stat& status, MakePath makePath) {
     noteChange(status);
     if (status.st_nlink == 1 || tree_.isFirstName(status.st_ino))
-        usage_.bytes += static_cast<std::uint64_t>(status.st_blocks) * blockBytes;
+        usage_.bytes += static_cast<std::uint64_t>(status.st_blocks * platform::blockBytes);
     else if (logs(logLevelDebug))
         tree_.write(logLevelDebug, formatted("Skipping hardlinked file at %s", ZOR_SHOWN(fullPath(makePath()))));
 }

@@ -2,6 +2,7 @@
 #include "fs/Durability.h"
 
 #include "os/FileDescriptor.h"
+#include "os/FileModes.h"
 #include "platform/Errno.h"
 #include "plist/Codec.h"
 
@@ -9,6 +10,7 @@
 #include <cstdio>
 #include <cstring>
 #include <fcntl.h>
+#include <linux/magic.h>
 #include <string>
 #include <string_view>
 #include <sys/random.h>
@@ -25,7 +27,6 @@ namespace {
 
 constexpr std::size_t randomCharacters = 6;
 constexpr int namesTriedMax = 16;
-constexpr mode_t permissionBits = 07777;
 
 constexpr std::string_view temporaryMark = ".new-";
 /// The one name that a target's writes use, so that the next one finds what a stop left of the last: looking for it
@@ -60,7 +61,7 @@ ErrnoOr<FileDescriptor> writeNewFile(platform::Disk& disk, int directory, const 
     struct stat made{};
     if (::fstat(file.get(), &made) != 0)
         return Errno::last();
-    if ((made.st_mode & permissionBits) != mode)
+    if ((made.st_mode & platform::permissionBits) != mode)
         TRY(disk.changeMode(file.get(), mode));
     TRY(disk.write(file.get(), bytes));
     return file;
@@ -204,10 +205,6 @@ namespace zor::fs {
 
 namespace {
 
-// From the kernel's statfs numbers.
-constexpr long ext4Magic = 0xEF53; // ext2 and ext3 share it
-constexpr long xfsMagic = 0x58465342;
-
 /// The options in force of a mounted ext4, one a line, as its driver tells them; empty when it tells none.
 std::string ext4Options(dev_t device) {
     char link[64];
@@ -249,9 +246,9 @@ Ordering orderingOfFileSystem(int fd) {
     struct stat status{};
     if (::fstatfs(fd, &fileSystem) != 0 || ::fstat(fd, &status) != 0)
         return Ordering::none;
-    if (fileSystem.f_type == xfsMagic)
+    if (fileSystem.f_type == XFS_SUPER_MAGIC)
         return Ordering::journal;
-    if (fileSystem.f_type == ext4Magic && hasOrderedJournal(status.st_dev))
+    if (fileSystem.f_type == EXT4_SUPER_MAGIC && hasOrderedJournal(status.st_dev))
         return Ordering::journal;
     return Ordering::none;
 }

@@ -3,6 +3,7 @@
 
 #include "fs/Names.h"
 #include "os/FileDescriptor.h"
+#include "os/FileModes.h"
 #include "platform/Errno.h"
 
 #include <cerrno>
@@ -12,8 +13,6 @@
 namespace zor::fs {
 
 namespace {
-
-constexpr mode_t closedMode = 0700;
 
 /// A directory of the daemon's own that nobody else may enter.
 OpenResult openClosed(int parent, const char* name) {
@@ -25,13 +24,13 @@ OpenResult openClosed(int parent, const char* name) {
     struct stat status{};
     if (::fstat(opened->get(), &status) != 0)
         return Errno::last();
-    if (status.st_uid != ::geteuid() || (status.st_mode & 0777) != closedMode)
+    if (status.st_uid != ::geteuid() || (status.st_mode & 0777) != platform::closedMode)
         return Errno(EPERM);
     return opened;
 }
 
 Errno makeIfMissing(platform::Disk& disk, int parent, const char* name) {
-    const Errno made = disk.makeDirectory(parent, name, closedMode);
+    const Errno made = disk.makeDirectory(parent, name, platform::closedMode);
     return made == EEXIST ? Errno() : made;
 }
 

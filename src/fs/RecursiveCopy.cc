@@ -6,6 +6,7 @@
 
 #include "fs/TreeWalker.h"
 #include "os/FileDescriptor.h"
+#include "os/FileModes.h"
 #include "platform/Errno.h"
 
 #include <array>
@@ -25,7 +26,6 @@ using platform::FileDescriptor;
 
 namespace {
 
-constexpr mode_t permissionBits = 07777;
 /// The bits of its mode that a copied file keeps: set-user-ID and set-group-ID are not copied.
 constexpr mode_t filePermissionBits = 01777;
 /// The bits that content keeps.
@@ -176,7 +176,7 @@ Errno Copier::endDirectory(const WalkEntry& entry) {
     const Errno result = rules_ && entry.depth == 0 ? Errno()
                                                     : finish(entry.directory, destination_.top(), status,
                                                              rules_ ? (status.st_mode & accessBits) | S_IRWXU
-                                                                    : status.st_mode & permissionBits);
+                                                                    : status.st_mode & platform::permissionBits);
     if (!result) {
         destination_.pop();
         accessTimes_.pop_back();

@@ -7,6 +7,7 @@
 #include "fs/PathResolver.h"
 #include "fs/TreeWalker.h"
 #include "os/FileDescriptor.h"
+#include "os/FileModes.h"
 
 #include <cerrno>
 #include <fcntl.h>
@@ -24,8 +25,6 @@ namespace {
 constexpr int namesTriedMax = 16;
 /// Users can mount in any number of places; behind these the log has said enough.
 constexpr std::size_t leftSaidMax = 200;
-constexpr mode_t closedMode = 0700;
-constexpr mode_t permissionBits = 07777;
 
 /// lstat.
 Errno statusBelow(int base, const std::string& relativePath, Mounts mounts, struct stat& status) {
@@ -144,7 +143,7 @@ Result<void> ZORFileManager::mendDirectory(int directory, const FileURL& url, co
         TRY(classSet(setClassAtCreation(directory, protectionClass), url.path(), protectionClass));
     struct stat parent{};
     const bool groupFits = attributes.owner == ownerUnchanged || status.st_gid == attributes.owner;
-    const mode_t mode = status.st_mode & permissionBits;
+    const mode_t mode = status.st_mode & platform::permissionBits;
     if (groupFits && mode == attributes.mode)
         return {};
     // Any user who can write the parent can have given its name to another directory of this owner's, one that is
@@ -181,7 +180,7 @@ Result<FileDescriptor> ZORFileManager::makeNewDirectory(const Base& base, std::s
     Errno made = parent ? Errno(EEXIST) : parent.error();
     for (int tried = 0; parent && made == EEXIST && tried < namesTriedMax; ++tried) {
         name = uniqueName(finalName + ".");
-        made = disk_.makeDirectory(parent->get(), name.c_str(), closedMode);
+        made = disk_.makeDirectory(parent->get(), name.c_str(), platform::closedMode);
     }
     const std::string temporaryPath = parent ? parentUrl.appendingDirectory(name).path() : url.path();
     if (made == EEXIST)
@@ -259,7 +258,7 @@ Result<FileURL> ZORFileManager::createTemporaryDirectoryInDirectoryURL(const Fil
     Errno made = parent ? Errno(EEXIST) : parent.error();
     for (int tried = 0; parent && made == EEXIST && tried < namesTriedMax; ++tried) {
         name = uniqueName("temp.");
-        made = disk_.makeDirectory(parent->get(), name.c_str(), closedMode);
+        made = disk_.makeDirectory(parent->get(), name.c_str(), platform::closedMode);
     }
     FileURL url = directory.appendingDirectory(name);
     if (made)

@@ -5,6 +5,7 @@
 #include "fs/Durability.h"
 #include "fs/MountFences.h"
 #include "os/FileDescriptor.h"
+#include "os/FileModes.h"
 #include "plist/Codec.h"
 #include "store/StorePlaces.h"
 
@@ -24,8 +25,6 @@ using platform::openBeneath;
 
 namespace {
 
-constexpr mode_t closedMode = 0700;
-constexpr mode_t permissionBits = 07777;
 constexpr const char* function = "createOrLookupContainerForUser";
 constexpr mode_t metadataMode = 0644;
 
@@ -95,7 +94,7 @@ ZORError ContainerBuilder::subdirectoryError(Here here, const char* subdirectory
 
 Result<void> ContainerBuilder::_createTopLevelContainerDirectory() {
     const std::string name(staging_.lastPathComponent());
-    if (const Errno made = disk_.makeDirectory(parent_, name.c_str(), closedMode))
+    if (const Errno made = disk_.makeDirectory(parent_, name.c_str(), platform::closedMode))
         return topLevelError(ZOR_HERE, made, "mkdir");
     auto directory = openBeneath(parent_, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
     if (!directory)
@@ -162,7 +161,7 @@ ContainerBuilder::Modes ContainerBuilder::modesOfSubdirectories() const {
     struct stat status{};
     const bool isRight = !subdirectories_.empty() && subdirectories_.front().parent == directory_.get() &&
                          !fs::statusOfName(directory_.get(), subdirectories_.front().name, status) &&
-                         (status.st_mode & permissionBits) == layout_.subdirectoryMode;
+                         (status.st_mode & platform::permissionBits) == layout_.subdirectoryMode;
     return isRight ? Modes::right : Modes::unknown;
 }
 

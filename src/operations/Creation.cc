@@ -25,7 +25,7 @@ std::optional<ZORContainerCache::LiveContainer> lookUpUndisturbed(ZORLocks& lock
 
 namespace {
 
-constexpr const char* function = "createOrLookupContainerForUser";
+constexpr const char* creationFunction = "createOrLookupContainerForUser";
 
 /// The part of a record that a reply needs; the caller holds the lock that guards it.
 FoundContainer snapshot(const std::shared_ptr<ZORMetadata>& record) {
@@ -38,7 +38,7 @@ Result<FoundContainer> Creation::createOrLookupContainerForUser(const Caller& ca
                                                                 const std::string* identifier,
                                                                 ContainerClass containerClass,
                                                                 const CreateOrLookupOptions& options) {
-    return needs_.boundary.run({function, __LINE__}, [&]() -> Result<FoundContainer> {
+    return needs_.boundary.run({creationFunction, __LINE__}, [&]() -> Result<FoundContainer> {
         TRY(checkRequest(caller, userId, identifier, containerClass));
         if (!options.transient)
             if (auto live = lookUpUndisturbed(needs_.locks, needs_.cache, userId, containerClass, *identifier)) {
@@ -63,7 +63,7 @@ Result<std::optional<FoundContainer>>
 Creation::createOrLookupContainerForUser(const Caller& caller, std::uint32_t userId, const std::string* identifier,
                                          ContainerClass containerClass, const CreateOrLookupOptions& options,
                                          BuiltAhead& ahead, const AllIdentifiersWriteLock& lock) {
-    return needs_.boundary.run({function, __LINE__}, [&]() -> Result<std::optional<FoundContainer>> {
+    return needs_.boundary.run({creationFunction, __LINE__}, [&]() -> Result<std::optional<FoundContainer>> {
         TRY(checkRequest(caller, userId, identifier, containerClass));
         return createOrLookup({caller, userId, *identifier, containerClass, options}, ahead.container, lock);
     });
@@ -71,7 +71,7 @@ Creation::createOrLookupContainerForUser(const Caller& caller, std::uint32_t use
 
 Result<void> Creation::checkRequest(const Caller& caller, std::uint32_t userId, const std::string* identifier,
                                     ContainerClass containerClass) {
-    const Reporter report(needs_.log, function);
+    const Reporter report(needs_.log, creationFunction);
     const long classNumber = static_cast<long>(containerClass);
     if (!identifier || !ipc::isIdentifier(*identifier) || !isValidClass(containerClass))
         return report.error(ErrorCode::invalidObject, "Can't act on an invalid object: userId: %u, ID: %s, class: %ld",
@@ -135,7 +135,7 @@ Result<std::optional<FoundContainer>> Creation::createOrLookup(const Wanted& wan
     else if (!record.error().is(ErrorCode::notFound))
         return std::move(record).error();
     if (!options.createIfNecessary)
-        return Reporter(needs_.log, function)
+        return Reporter(needs_.log, creationFunction)
             .unlogged(ErrorCode::notFound, "Container with identifier: \"%s\" Not Found", ZOR_SHOWN(identifier));
     // One in the place of another makes the user's share no larger.
     if (!record && !options.replacesAnother)
@@ -149,7 +149,7 @@ Result<void> Creation::checkShare(const Wanted& wanted) {
     const std::size_t containers = needs_.cache.heldByUser(wanted.userId).containers;
     if (containers < needs_.limits.containersMaxPerUser)
         return {};
-    return Reporter(needs_.log, function)
+    return Reporter(needs_.log, creationFunction)
         .error(ErrorCode::valueNotAllowed,
                "User %u has %llu containers, and no more may be made: %s. Delete some, or start zorvaned with a larger "
                "--containers-per-user",
@@ -162,7 +162,7 @@ Result<void> Creation::discardTransient(const ZORMetadata& record, const std::st
                                                                 topLevelOwnerOf(record.containerClass(), record.uid()));
     // With another's directory in its place, the container is gone.
     if (!moved && !(moved.error().underlying() && moved.error().underlying()->isPosix(DeathRow::notTheContainer)))
-        return Reporter(needs_.log, function)
+        return Reporter(needs_.log, creationFunction)
             .error(ErrorCode::transientRemovalFailed, &moved.error(), "Failed to remove transient container at %s",
                    url.c_str());
     // With its directory gone the record would answer "no metadata" for this identifier until the daemon ends, should
@@ -182,7 +182,7 @@ Result<FoundContainer> Creation::create(const Wanted& wanted, std::optional<Cont
     record->setTransient(transient);
     const auto added = needs_.cache.addContainerMetadata(record, wanted.userId, ContainerPlace(live), transient);
     if (!added)
-        return Reporter(needs_.log, function)
+        return Reporter(needs_.log, creationFunction)
             .error(ErrorCode::cacheAddFailed, &added.error(),
                    "Failed to add to cache for %u : %s, url: %s, transient: %d", wanted.userId,
                    ZOR_SHOWN(wanted.identifier), live.c_str(), transient);
@@ -198,7 +198,7 @@ Result<void> Creation::makeDurable(const FoundContainer& container) {
     const auto failed = container.movedInto ? needs_.moves.syncDirectory(*container.movedInto, live)
                                             : needs_.moves.syncDirectories({live.deletingLastPathComponent()});
     if (failed)
-        return needs_.moves.notLasting(function, ErrorCode::moveToLiveFailed, live, *failed);
+        return needs_.moves.notLasting(creationFunction, ErrorCode::moveToLiveFailed, live, *failed);
     container.record->setDurable(true);
     return {};
 }

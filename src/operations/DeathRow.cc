@@ -5,6 +5,7 @@
 #include "fs/FileSystemDeathRow.h"
 #include "fs/Names.h"
 #include "os/FileDescriptor.h"
+#include "os/FileModes.h"
 #include "store/StorePlaces.h"
 
 #include <cerrno>
@@ -227,7 +228,6 @@ Result<void> DeathRow::putBackIfAnothers(int from, const FileURL& url, int to, c
 namespace {
 
 constexpr const char* passFunction = "deleteContainersOnDeathRowWithCompletion";
-constexpr mode_t closedMode = 0700;
 
 const char* undeletedMark() {
     return ::geteuid() == 0 ? names::undeletedAttribute : names::undeletedAttributeUser;
@@ -237,15 +237,15 @@ const char* undeletedMark() {
 Errno closeAndMark(platform::Disk& disk, int directory) {
     static constexpr std::uint8_t mark[] = {'1'};
     TRY(disk.changeOwner(directory, ::geteuid(), ::getegid()));
-    TRY(disk.changeMode(directory, closedMode));
+    TRY(disk.changeMode(directory, platform::closedMode));
     return disk.setAttribute(directory, undeletedMark(), mark);
 }
 
 /// Whether an open directory is what closeAndMark made of it.
 bool isClosedAndMarked(int directory) {
     struct stat status{};
-    return ::fstat(directory, &status) == 0 && status.st_uid == ::geteuid() && (status.st_mode & 0777) == closedMode &&
-           ::fgetxattr(directory, undeletedMark(), nullptr, 0) > 0;
+    return ::fstat(directory, &status) == 0 && status.st_uid == ::geteuid() &&
+           (status.st_mode & 0777) == platform::closedMode && ::fgetxattr(directory, undeletedMark(), nullptr, 0) > 0;
 }
 
 } // namespace

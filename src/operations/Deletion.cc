@@ -11,12 +11,12 @@ namespace zor {
 
 namespace {
 
-constexpr const char* function = "stageForDeleteContainersWithUsers";
+constexpr const char* deletionFunction = "stageForDeleteContainersWithUsers";
 
 } // namespace
 
 Result<void> ContainerRemoval::stage(const ContainerToGo& container) {
-    return needs_.boundary.run({function, __LINE__}, [&]() -> Result<void> {
+    return needs_.boundary.run({deletionFunction, __LINE__}, [&]() -> Result<void> {
         std::vector<FileURL> changed;
         needs_.cache.prepare(container.userId, container.containerClass);
         auto staged = needs_.recovery.undisturbed([&] {
@@ -29,7 +29,7 @@ Result<void> ContainerRemoval::stage(const ContainerToGo& container) {
 
 Result<void> ContainerRemoval::stage(const ContainerToGo& container, std::vector<FileURL>& changed,
                                      const AllIdentifiersWriteLock& lock) {
-    return needs_.boundary.run({function, __LINE__}, [&]() -> Result<void> {
+    return needs_.boundary.run({deletionFunction, __LINE__}, [&]() -> Result<void> {
         const auto record = TRY(find(container, lock));
         return record ? take(container, *record, changed, lock) : Result<void>();
     });
@@ -44,7 +44,7 @@ Result<std::shared_ptr<ZORMetadata>> ContainerRemoval::find(const ContainerToGo&
 
 Result<void> ContainerRemoval::take(const ContainerToGo& container, const ZORMetadata& record,
                                     std::vector<FileURL>& changed, const AllIdentifiersWriteLock& lock) {
-    const Reporter report(needs_.log, function);
+    const Reporter report(needs_.log, deletionFunction);
     const auto& [userId, uuid, identifier, containerClass] = container;
     const bool transient = record.transient();
     lock.touch(Touches::only({record.identifier()}));
@@ -67,7 +67,7 @@ Result<void> ContainerRemoval::conclude(Result<void> staged, std::vector<FileURL
     const auto failed = needs_.moves.syncDirectories(std::move(changed));
     if (!staged || !failed)
         return staged;
-    return Reporter(needs_.log, function)
+    return Reporter(needs_.log, deletionFunction)
         .error(ErrorCode::listForDeletionFailed, &*failed, "Failed to make deletions durable: %s",
                failed->text().c_str());
 }
@@ -90,7 +90,7 @@ bool ContainerRemoval::takeAway(const FileURL& container, std::optional<std::uin
         changed.push_back(deathRow);
         return true;
     }
-    Reporter(needs_.log, function)
+    Reporter(needs_.log, deletionFunction)
         .error(ErrorCode::listForDeletionFailed, &moved.error(), "Failed to delete container at %s: %s",
                container.c_str(), moved.error().text().c_str());
     return false;
@@ -129,10 +129,10 @@ struct Deletion::Progress {
 };
 
 Result<void> Deletion::stageForDeleteContainersWithUsers(const DeletionBatch& batch) {
-    return needs_.boundary.run({function, __LINE__}, [&]() -> Result<void> {
+    return needs_.boundary.run({deletionFunction, __LINE__}, [&]() -> Result<void> {
         const std::size_t count = batch.uuids.size();
         if (count != batch.classes.size() || count != batch.identifiers.size())
-            return Reporter(needs_.log, function)
+            return Reporter(needs_.log, deletionFunction)
                 .error(ErrorCode::invalidObject,
                        "Can't act on an invalid input: UUIDString count: %ld, class count: %ld, ID count: %ld",
                        static_cast<long>(count), static_cast<long>(batch.classes.size()),
@@ -179,7 +179,7 @@ Result<void> Deletion::stageNext(const DeletionBatch& batch, Progress& progress,
 
 Result<void> Deletion::stageForDelete(const DeletionBatch& batch, Progress& progress,
                                       const AllIdentifiersWriteLock& lock) {
-    const Reporter report(needs_.log, function);
+    const Reporter report(needs_.log, deletionFunction);
     const std::size_t index = progress.next;
     const std::uint32_t userId = userAt(batch.users, index);
     if (!batch.classes[index]) {

@@ -11,7 +11,7 @@ namespace zor {
 
 namespace {
 
-constexpr const char* function = "diskUsageForUserId";
+constexpr const char* measurementFunction = "diskUsageForUserId";
 const std::string staticDiskUsageKey(ipc::infoKeys::staticDiskUsage);
 
 /// Any number counts, read as an unsigned one.
@@ -41,20 +41,20 @@ void DiskUsage::keepDiskUsage(const Caller& caller, const ContainerAddress& addr
     const plist::Value value(bytes);
     const auto kept = needs_.infoValues.setInfoValue(caller, &value, &staticDiskUsageKey, address, lock);
     if (!kept)
-        needs_.log.write(logLevelError, function,
+        needs_.log.write(logLevelError, measurementFunction,
                          "Error setting info value for userId: %u, identifier: %s, Class: %llu: %llu", address.userId,
                          ZOR_SHOWN(address.identifier), static_cast<unsigned long long>(address.containerClass),
                          static_cast<unsigned long long>(kept.error().replyCode()));
 }
 
 Result<std::uint64_t> DiskUsage::diskUsage(const Caller& caller, const ContainerAddress& address) {
-    TRY(checkAddress(needs_.log, function, address));
+    TRY(checkAddress(needs_.log, measurementFunction, address));
     bool isKept = false;
     FileURL container;
     fs::OpenResult directory = Errno(ENOENT);
     {
         const IdentifierWriteLock lock(needs_.locks, address.lockName(), Touches::nothing());
-        const auto record = TRY(knownContainer(needs_.log, needs_.cache, function, address, lock));
+        const auto record = TRY(knownContainer(needs_.log, needs_.cache, measurementFunction, address, lock));
         isKept = isBundleClass(address.containerClass) && !record->transient();
         if (isKept)
             if (const auto kept = keptDiskUsage(*record))
@@ -80,7 +80,7 @@ Result<std::uint64_t> DiskUsage::diskUsage(const Caller& caller, const Container
 }
 
 DiskUsageAnswer DiskUsage::diskUsageForUserId(const Caller& caller, const ContainerAddress& address) {
-    const auto measured = needs_.boundary.run({function, __LINE__},
+    const auto measured = needs_.boundary.run({measurementFunction, __LINE__},
                                               [&]() -> Result<std::uint64_t> { return diskUsage(caller, address); });
     if (measured)
         return {.bytes = *measured};

@@ -29,9 +29,9 @@ std::uint64_t bigEndian(const std::uint8_t* at, std::size_t width) {
     return number;
 }
 
-class Reader {
+class BinaryReader {
 public:
-    explicit Reader(Bytes bytes) : bytes_(bytes), memoryLeft_(memoryBytesMax(bytes.size())) {}
+    explicit BinaryReader(Bytes bytes) : bytes_(bytes), memoryLeft_(memoryBytesMax(bytes.size())) {}
 
     std::expected<Value, ReadError> read();
 
@@ -96,14 +96,14 @@ private:
     ReadError error_;
 };
 
-std::expected<Value, ReadError> Reader::read() {
+std::expected<Value, ReadError> BinaryReader::read() {
     Value root;
     if (!readTrailer() || !readObject(root_, root))
         return std::unexpected(error_);
     return root;
 }
 
-bool Reader::readTrailer() {
+bool BinaryReader::readTrailer() {
     const std::size_t size = bytes_.size();
     if (size < binary::magic.size() || std::memcmp(bytes_.data(), binary::magic.data(), binary::magic.size()) != 0)
         return fail(0, "not a binary property list of version 00");
@@ -131,7 +131,7 @@ bool Reader::readTrailer() {
     return true;
 }
 
-bool Reader::locate(std::uint64_t number, std::size_t& at) {
+bool BinaryReader::locate(std::uint64_t number, std::size_t& at) {
     if (number >= objectCount_)
         return fail(bytes_.size() - binary::trailerBytes, "a reference to an object that does not exist");
     const std::size_t entry = tableAt_ + static_cast<std::size_t>(number) * offsetWidth_;
@@ -142,7 +142,7 @@ bool Reader::locate(std::uint64_t number, std::size_t& at) {
     return true;
 }
 
-bool Reader::readHeader(std::size_t at, Header& header) {
+bool BinaryReader::readHeader(std::size_t at, Header& header) {
     const std::uint8_t marker = bytes_[at];
     header.kind = static_cast<Kind>(marker >> 4);
     header.low = marker & 0xFU;
@@ -164,7 +164,7 @@ bool Reader::readHeader(std::size_t at, Header& header) {
     return fail(at, "an object of a type that property lists do not have");
 }
 
-bool Reader::readCount(std::size_t& at, std::size_t& count) {
+bool BinaryReader::readCount(std::size_t& at, std::size_t& count) {
     if (!holds(at, 1, 1))
         return fail(at, "a count that is cut off");
     const std::uint8_t marker = bytes_[at];
@@ -179,7 +179,7 @@ bool Reader::readCount(std::size_t& at, std::size_t& count) {
     return true;
 }
 
-bool Reader::enter(std::uint64_t number, std::size_t at) {
+bool BinaryReader::enter(std::uint64_t number, std::size_t at) {
     const auto last = open_.begin() + static_cast<std::ptrdiff_t>(nesting_);
     if (std::find(open_.begin(), last, number) != last)
         return fail(at, "a container that contains itself");
@@ -189,7 +189,7 @@ bool Reader::enter(std::uint64_t number, std::size_t at) {
     return true;
 }
 
-bool Reader::readObject(std::uint64_t number, Value& out) {
+bool BinaryReader::readObject(std::uint64_t number, Value& out) {
     std::size_t at = 0;
     Header header;
     if (!locate(number, at) || !readHeader(at, header))
@@ -225,14 +225,14 @@ bool Reader::readObject(std::uint64_t number, Value& out) {
     return fail(at, "an object of a type that property lists do not have");
 }
 
-bool Reader::readSimple(const Header& header, Value& out) {
+bool BinaryReader::readSimple(const Header& header, Value& out) {
     if (header.low != binary::markerFalse && header.low != binary::markerTrue)
         return fail(header.content - 1, "a null or fill object");
     out = Value(header.low == binary::markerTrue);
     return true;
 }
 
-bool Reader::readInteger(const Header& header, Value& out) {
+bool BinaryReader::readInteger(const Header& header, Value& out) {
     if (header.low > 4)
         return fail(header.content - 1, "an integer of more than 16 bytes");
     const std::size_t width = std::size_t{1} << header.low;
@@ -252,7 +252,7 @@ bool Reader::readInteger(const Header& header, Value& out) {
     return true;
 }
 
-bool Reader::readReal(const Header& header, Value& out) {
+bool BinaryReader::readReal(const Header& header, Value& out) {
     if (header.low != 2 && header.low != 3)
         return fail(header.content - 1, "a real of neither 4 nor 8 bytes");
     const std::size_t width = std::size_t{1} << header.low;
@@ -266,7 +266,7 @@ bool Reader::readReal(const Header& header, Value& out) {
     return true;
 }
 
-bool Reader::readDate(const Header& header, Value& out) {
+bool BinaryReader::readDate(const Header& header, Value& out) {
     if (header.low != 3)
         return fail(header.content - 1, "a date that is not 8 bytes");
     if (!holds(header.content, 1, 8))
@@ -275,7 +275,7 @@ bool Reader::readDate(const Header& header, Value& out) {
     return true;
 }
 
-bool Reader::readData(const Header& header, Value& out) {
+bool BinaryReader::readData(const Header& header, Value& out) {
     if (!holds(header.content, header.count, 1))
         return fail(header.content, "data that is cut off");
     if (!charge(header.content, header.count))
@@ -285,11 +285,11 @@ bool Reader::readData(const Header& header, Value& out) {
     return true;
 }
 
-bool Reader::readString(const Header& header, std::string& out) {
+bool BinaryReader::readString(const Header& header, std::string& out) {
     return header.kind == Kind::ascii ? readAscii(header, out) : readUtf16(header, out);
 }
 
-bool Reader::readAscii(const Header& header, std::string& out) {
+bool BinaryReader::readAscii(const Header& header, std::string& out) {
     if (!holds(header.content, header.count, 1))
         return fail(header.content, "a string that is cut off");
     if (!charge(header.content, header.count))
@@ -301,7 +301,7 @@ bool Reader::readAscii(const Header& header, std::string& out) {
     return true;
 }
 
-bool Reader::readUtf16(const Header& header, std::string& out) {
+bool BinaryReader::readUtf16(const Header& header, std::string& out) {
     if (!holds(header.content, header.count, 2))
         return fail(header.content, "a string that is cut off");
     // A unit of two bytes becomes at most three bytes of UTF-8.
@@ -327,7 +327,7 @@ bool Reader::readUtf16(const Header& header, std::string& out) {
     return true;
 }
 
-bool Reader::readKey(std::uint64_t number, std::string& out) {
+bool BinaryReader::readKey(std::uint64_t number, std::string& out) {
     std::size_t at = 0;
     Header header;
     if (!locate(number, at) || !readHeader(at, header))
@@ -337,7 +337,7 @@ bool Reader::readKey(std::uint64_t number, std::string& out) {
     return readString(header, out);
 }
 
-bool Reader::readArray(const Header& header, Value& out) {
+bool BinaryReader::readArray(const Header& header, Value& out) {
     if (!holds(header.content, header.count, referenceWidth_))
         return fail(header.content, "an array that is cut off");
     if (!charge(header.content, header.count * sizeof(Value)))
@@ -351,7 +351,7 @@ bool Reader::readArray(const Header& header, Value& out) {
     return true;
 }
 
-bool Reader::readDictionary(const Header& header, Value& out) {
+bool BinaryReader::readDictionary(const Header& header, Value& out) {
     if (!holds(header.content, header.count, 2 * referenceWidth_))
         return fail(header.content, "a dictionary that is cut off");
     if (!charge(header.content, header.count * sizeof(Dictionary::Entry)))
@@ -384,7 +384,7 @@ bool looksBinary(std::span<const std::uint8_t> bytes) {
 }
 
 std::expected<Value, ReadError> readBinary(std::span<const std::uint8_t> bytes) {
-    return Reader(bytes).read();
+    return BinaryReader(bytes).read();
 }
 
 } // namespace zor::plist

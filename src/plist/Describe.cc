@@ -12,7 +12,6 @@ namespace zor::plist {
 namespace {
 
 constexpr std::string_view cutMark = "...";
-constexpr char hexDigits[] = "0123456789abcdef";
 
 class Describer {
 public:

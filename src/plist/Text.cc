@@ -73,8 +73,6 @@ bool isUtf8(std::string_view text) {
 
 namespace {
 
-constexpr std::string_view hexDigits = "0123456789abcdef";
-
 struct Range {
     char32_t first;
     char32_t last;

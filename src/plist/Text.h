@@ -50,6 +50,9 @@ inline bool isAsciiWithoutNul(const char* bytes, std::size_t count) {
 /// writing, ends a line or is not seen. Every escaping of text asks here.
 [[nodiscard]] bool isShown(char32_t character);
 
+/// As escapes and the text of data have them.
+inline constexpr std::string_view hexDigits = "0123456789abcdef";
+
 /// A tab steers no terminal, but it can move a column of a table, or stand for its end.
 enum class Tabs : std::uint8_t { stay, escaped };
 

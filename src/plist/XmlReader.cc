@@ -191,9 +191,9 @@ struct ParserFree {
 /// Builds the value from the parser's events. Open containers are frames on a stack of at most nestingMax; nothing
 /// recurses. The parser is C: no exception may pass through it, so one that a handler meets is kept and thrown on when
 /// it has returned.
-class Reader {
+class XmlReader {
 public:
-    Reader();
+    XmlReader();
     std::expected<Value, ReadError> read(std::span<const std::uint8_t> bytes);
 
 private:
@@ -225,8 +225,8 @@ private:
 };
 
 template <typename Body>
-void Reader::guarded(void* self, Body body) noexcept {
-    auto& reader = *static_cast<Reader*>(self);
+void XmlReader::guarded(void* self, Body body) noexcept {
+    auto& reader = *static_cast<XmlReader*>(self);
     if (reader.failed())
         return;
     try {
@@ -237,7 +237,7 @@ void Reader::guarded(void* self, Body body) noexcept {
     }
 }
 
-Reader::Reader() : parser_(XML_ParserCreate(nullptr)) {
+XmlReader::XmlReader() : parser_(XML_ParserCreate(nullptr)) {
     if (!parser_)
         throw std::bad_alloc();
     XML_Parser parser = parser_.get();
@@ -245,31 +245,31 @@ Reader::Reader() : parser_(XML_ParserCreate(nullptr)) {
     XML_SetElementHandler(
         parser,
         [](void* self, const XML_Char* name, const XML_Char** attributes) {
-            guarded(self, [=](Reader& reader) { reader.start(name, attributes); });
+            guarded(self, [=](XmlReader& reader) { reader.start(name, attributes); });
         },
-        [](void* self, const XML_Char* name) { guarded(self, [=](Reader& reader) { reader.end(name); }); });
+        [](void* self, const XML_Char* name) { guarded(self, [=](XmlReader& reader) { reader.end(name); }); });
     XML_SetCharacterDataHandler(parser, [](void* self, const XML_Char* characters, int count) {
-        guarded(self, [=](Reader& reader) { reader.text(characters, count); });
+        guarded(self, [=](XmlReader& reader) { reader.text(characters, count); });
     });
     // Stops before the first declaration is looked at. The declaration handler is the second lock on the same door.
     XML_SetStartDoctypeDeclHandler(
         parser, [](void* self, const XML_Char*, const XML_Char*, const XML_Char*, int hasInternalSubset) {
             if (hasInternalSubset != 0)
-                guarded(self, [](Reader& reader) { reader.fail("a document type with declarations of its own"); });
+                guarded(self, [](XmlReader& reader) { reader.fail("a document type with declarations of its own"); });
         });
     XML_SetEntityDeclHandler(parser, [](void* self, const XML_Char*, int, const XML_Char*, int, const XML_Char*,
                                         const XML_Char*, const XML_Char*, const XML_Char*) {
-        guarded(self, [](Reader& reader) { reader.fail("an entity declaration"); });
+        guarded(self, [](XmlReader& reader) { reader.fail("an entity declaration"); });
     });
     // With a document type that is named but not read, the parser takes unknown entities for declared there and would
     // silently leave them out of the text.
     XML_SetSkippedEntityHandler(parser, [](void* self, const XML_Char*, int) {
-        guarded(self, [](Reader& reader) { reader.fail("an entity that is not predefined"); });
+        guarded(self, [](XmlReader& reader) { reader.fail("an entity that is not predefined"); });
     });
     XML_SetParamEntityParsing(parser, XML_PARAM_ENTITY_PARSING_NEVER);
 }
 
-std::expected<Value, ReadError> Reader::read(std::span<const std::uint8_t> bytes) {
+std::expected<Value, ReadError> XmlReader::read(std::span<const std::uint8_t> bytes) {
     if (bytes.size() > xmlBytesMax)
         return std::unexpected(ReadError{.offset = xmlBytesMax, .reason = "too long for an XML property list"});
     // In one piece: nothing is scanned twice, however long a token is.
@@ -284,7 +284,7 @@ std::expected<Value, ReadError> Reader::read(std::span<const std::uint8_t> bytes
     return std::move(*root_);
 }
 
-void Reader::fail(const char* reason) {
+void XmlReader::fail(const char* reason) {
     if (error_)
         return;
     const XML_Index at = XML_GetCurrentByteIndex(parser_.get());
@@ -293,7 +293,7 @@ void Reader::fail(const char* reason) {
 }
 
 /// Null when the element may start here.
-const char* Reader::whyNotHere(Element element) const {
+const char* XmlReader::whyNotHere(Element element) const {
     if (element == Element::none)
         return "an element that property lists do not have";
     if (scalar_ != Element::none)
@@ -315,7 +315,7 @@ const char* Reader::whyNotHere(Element element) const {
     return nullptr;
 }
 
-void Reader::start(const XML_Char* name, const XML_Char** attributes) {
+void XmlReader::start(const XML_Char* name, const XML_Char** attributes) {
     const Element element = elementNamed(name);
     if (const char* reason = whyNotHere(element))
         return fail(reason);
@@ -333,7 +333,7 @@ void Reader::start(const XML_Char* name, const XML_Char** attributes) {
     text_.clear();
 }
 
-void Reader::text(const XML_Char* characters, int count) {
+void XmlReader::text(const XML_Char* characters, int count) {
     const std::string_view part(characters, static_cast<std::size_t>(count));
     if (scalar_ != Element::none)
         text_ += part;
@@ -341,7 +341,7 @@ void Reader::text(const XML_Char* characters, int count) {
         fail("text outside a scalar");
 }
 
-void Reader::end(const XML_Char* name) {
+void XmlReader::end(const XML_Char* name) {
     switch (elementNamed(name)) {
     case Element::plist:
         if (!root_)
@@ -357,7 +357,7 @@ void Reader::end(const XML_Char* name) {
     }
 }
 
-void Reader::put(Value value) {
+void XmlReader::put(Value value) {
     if (frames_.empty()) {
         root_ = std::move(value);
         return;
@@ -371,7 +371,7 @@ void Reader::put(Value value) {
     frame.key.reset();
 }
 
-void Reader::endContainer() {
+void XmlReader::endContainer() {
     Frame frame = std::move(frames_.back());
     frames_.pop_back();
     if (frame.key)
@@ -382,7 +382,7 @@ void Reader::endContainer() {
         put(Dictionary::fromUnsorted(std::move(frame.entries)));
 }
 
-std::optional<Value> Reader::scalar() const {
+std::optional<Value> XmlReader::scalar() const {
     const bool blank = std::all_of(text_.begin(), text_.end(), isSpace);
     switch (scalar_) {
     case Element::integer:
@@ -401,7 +401,7 @@ std::optional<Value> Reader::scalar() const {
     }
 }
 
-void Reader::endScalar() {
+void XmlReader::endScalar() {
     // The parser checks what it decodes; the promise that strings are valid does not rest on it.
     if (!isUtf8(text_))
         return fail("text that is not UTF-8");
@@ -422,7 +422,7 @@ std::expected<Value, ReadError> readPropertyList(std::span<const std::uint8_t> b
 }
 
 std::expected<Value, ReadError> readXml(std::span<const std::uint8_t> bytes) {
-    return Reader().read(bytes);
+    return XmlReader().read(bytes);
 }
 
 } // namespace zor::plist

@@ -7,6 +7,7 @@
 #include "ipc/Protocol.h"
 #include "os/FileChanges.h"
 #include "os/FileDescriptor.h"
+#include "os/FileModes.h"
 #include "store/StorePlaces.h"
 
 #include <algorithm>
@@ -244,9 +245,9 @@ using platform::RecursiveMutexLock;
 
 namespace {
 
-constexpr mode_t closedMode = 0700;
 /// Files of the daemon itself stay readable while the device is locked. The home above them may be missing.
-constexpr DirectoryAttributes ownDirectory{.mode = 0755, .protectionClass = 4, .intermediateMode = closedMode};
+constexpr DirectoryAttributes ownDirectory{
+    .mode = 0755, .protectionClass = 4, .intermediateMode = platform::closedMode};
 constexpr DirectoryAttributes plainDirectory{.mode = 0755};
 
 DirectoryAttributes ownedBy(std::uint32_t installer) {
@@ -389,14 +390,14 @@ Result<bool> ZORGlobalConfiguration::closeHomeDirectory() {
     const fs::PathResolver& resolver = fileManager_.resolver();
     const auto opened = resolver.openDirectoryPath(home);
     if (!opened && opened.error() == ENOENT) {
-        TRY(fileManager_.createDirectoryAtURL(home, Intermediates::yes, {.mode = closedMode}));
+        TRY(fileManager_.createDirectoryAtURL(home, Intermediates::yes, {.mode = platform::closedMode}));
         return false;
     }
     struct stat status{};
     Errno failure = !opened ? opened.error() : ::fstat(opened->get(), &status) != 0 ? Errno::last() : Errno();
     const bool isOpen = !failure && (status.st_mode & (S_IRWXG | S_IRWXO)) != 0;
     if (!failure && isOpen && status.st_uid == ::geteuid())
-        failure = fileManager_.disk().changeMode(opened->get(), closedMode);
+        failure = fileManager_.disk().changeMode(opened->get(), platform::closedMode);
     else if (isOpen)
         failure = Errno(EPERM);
     if (failure)

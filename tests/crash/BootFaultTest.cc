@@ -148,32 +148,43 @@ TEST(BootFaultTest, TheNextBootFinishesIt) {
     }
 }
 
+struct FileSystemOfTheBoot {
+    std::string name;
+    DiskModel model;
+    Home home = Home::onRoot;
+};
+
+class BootPowerCutTest : public ::testing::TestWithParam<FileSystemOfTheBoot> {};
+
 // Goal: the same wherever the power goes in that boot, on a file system that keeps order, on one that keeps none, and
 // between two. Method: the boot recorded once; each state that a cut after one of its calls may leave is booted twice.
-TEST(BootPowerCutTest, TheNextBootFinishesIt) {
-    for (const auto& [model, home] :
-         {std::pair(DiskModel::orderedJournal, Home::onRoot), std::pair(DiskModel::unordered, Home::onRoot),
-          std::pair(DiskModel::orderedJournal, Home::mounted)}) {
-        SCOPED_TRACE(model == DiskModel::unordered ? "unordered" : home == Home::mounted ? "home" : "ordered");
-        if (home == Home::mounted && !test::MountedHome::canBe())
-            continue; // needs root
-        platform::LinuxDisk linuxDisk;
-        OldDevice old(linuxDisk, home);
-        Device& device = old.device;
-        RecordingDisk disk(linuxDisk, device.root.path(), {"run"});
-        disk.start();
-        device.start(disk, model == DiskModel::unordered ? noOrderAnywhere : journalEverywhere);
-        ASSERT_EQ(judgeMigrated(device.root.path(), *device.daemon, Bundle::known), "");
-        device.daemon.reset();
-        ASSERT_EQ(disk.complaint(), "");
-        const LoopReport report = forEachPowerCut(
-            disk.log(),
-            {.model = model, .randomStatesPerCut = isLongRun() ? 8U : 1U, .singleChangesMax = isLongRun() ? 24U : 4U},
-            [](const PowerCutState&, const std::string& root) { return judgeNextBoots(root, Bundle::known); });
-        EXPECT_EQ(report.complaint, "");
-        EXPECT_GT(report.examined, 30U);
-    }
+TEST_P(BootPowerCutTest, TheNextBootFinishesIt) {
+    const auto& [name, model, home] = GetParam();
+    if (home == Home::mounted && !test::MountedHome::canBe())
+        GTEST_SKIP() << "needs root";
+    platform::LinuxDisk linuxDisk;
+    OldDevice old(linuxDisk, home);
+    Device& device = old.device;
+    RecordingDisk disk(linuxDisk, device.root.path(), {"run"});
+    disk.start();
+    device.start(disk, model == DiskModel::unordered ? noOrderAnywhere : journalEverywhere);
+    ASSERT_EQ(judgeMigrated(device.root.path(), *device.daemon, Bundle::known), "");
+    device.daemon.reset();
+    ASSERT_EQ(disk.complaint(), "");
+    const LoopReport report = forEachPowerCut(
+        disk.log(),
+        {.model = model, .randomStatesPerCut = isLongRun() ? 8U : 1U, .singleChangesMax = isLongRun() ? 24U : 4U},
+        [](const PowerCutState&, const std::string& root) { return judgeNextBoots(root, Bundle::known); });
+    EXPECT_EQ(report.complaint, "");
+    EXPECT_GT(report.examined, 30U);
 }
+
+INSTANTIATE_TEST_SUITE_P(Boot, BootPowerCutTest,
+                         ::testing::Values(FileSystemOfTheBoot{"ordered", DiskModel::orderedJournal},
+                                           FileSystemOfTheBoot{"unordered", DiskModel::unordered},
+                                           FileSystemOfTheBoot{"between_two", DiskModel::orderedJournal,
+                                                               Home::mounted}),
+                         [](const auto& row) { return row.param.name; });
 
 } // namespace
 } // namespace zor::support

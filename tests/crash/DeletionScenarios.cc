@@ -64,7 +64,7 @@ Scenario going(const std::string& name, const std::vector<Request>& requests,
             .also = [=](const std::string& root, bool acted) { return judgeGone(root, acted, requests); }};
 }
 
-void prepareNothing(Device&) {}
+void prepareNoMore(Device&) {}
 
 /// The first of them, in one batch.
 bool stage(Device& device, const Victims& victims, std::size_t count) {
@@ -81,7 +81,7 @@ bool stage(Device& device, const Victims& victims, std::size_t count) {
 
 Scenario deletion() {
     const Request victim{"victim", ContainerClass::dataApplication, mobileUser};
-    return going("deletion", {victim}, prepareNothing, [victim](Device& device, const Victims&) {
+    return going("deletion", {victim}, prepareNoMore, [victim](Device& device, const Victims&) {
         const auto deleted =
             device.client().deleteContainerForUser(victim.userId, &victim.identifier, victim.containerClass, false);
         return deleted || deleted.error().is(ErrorCode::notFound);
@@ -92,7 +92,7 @@ Scenario deletionOfMany() {
     std::vector<Request> all;
     for (const char* identifier : {"victim.a", "victim.b", "victim.c"})
         all.push_back({identifier, ContainerClass::dataApplication, mobileUser});
-    return going("deletion of many", all, prepareNothing,
+    return going("deletion of many", all, prepareNoMore,
                  [](Device& device, const Victims& victims) { return stage(device, victims, victims.size()); });
 }
 

@@ -25,7 +25,7 @@ private:
     int syncs_ = 0;
 };
 
-std::string judge(const PowerCutState& state, const std::string& directory) {
+std::string judgeAfterCut(const PowerCutState& state, const std::string& directory) {
     if (readTree(directory).describe() != state.tree.describe())
         return "the state was not built as it is";
     const std::string content = readFile(directory + "/f");
@@ -49,7 +49,7 @@ TEST(PowerCutModelTest, TellsSoundFromWrong) {
         recording.mark();
         ASSERT_EQ(recording.complaint(), "");
         for (const DiskModel model : {DiskModel::orderedJournal, DiskModel::unordered}) {
-            const auto report = forEachPowerCut(recording.log(), {.model = model}, judge);
+            const auto report = forEachPowerCut(recording.log(), {.model = model}, judgeAfterCut);
             EXPECT_EQ(report.complaint.empty(), forgotten.empty()) << report.complaint;
             EXPECT_GT(report.examined, 3U);
         }

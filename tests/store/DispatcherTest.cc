@@ -226,8 +226,6 @@ TEST_F(Dispatch, RefusalsAreLimitedForEachUser) {
     EXPECT_EQ(world.log.take(3, "checkEntitlementsAndInitClientObject").size(), 4U);
 }
 
-const char* const byCaller = "com.veltra.Zorvane.EntitlementsRegisteredByCaller";
-
 class Shared : public Dispatch {
 protected:
     Shared() { asInstaller(); }

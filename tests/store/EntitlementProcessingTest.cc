@@ -21,7 +21,6 @@ const char* const apps = "com.veltra.security.application-groups";
 const char* const groups = "com.veltra.security.system-groups";
 const char* const groupContainers = "com.veltra.security.system-group-containers";
 const char* const systemContainer = "com.veltra.security.system-container";
-const char* const byCaller = "com.veltra.Zorvane.EntitlementsRegisteredByCaller";
 const char* const placeholder = "com.veltra.Zorvane.PlaceholderEntitlements";
 const char* const parent = "com.veltra.Zorvane.ParentBundleID";
 const char* const children = "com.veltra.Zorvane.ChildPluginBundleIDs";

@@ -29,6 +29,7 @@ inline constexpr std::uint32_t mobile = 501;
 inline constexpr std::uint32_t second = 502;
 inline constexpr ContainerClass application = ContainerClass::dataApplication;
 inline constexpr bool asTransient = true;
+inline constexpr const char* byCaller = "com.veltra.Zorvane.EntitlementsRegisteredByCaller";
 
 inline constexpr const char* cachesPath = "private/var/root/Library/Caches/com.veltra.zorvaned";
 inline constexpr const char* libraryPath = "private/var/root/Library/Zorvane";

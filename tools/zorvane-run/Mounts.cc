@@ -27,7 +27,7 @@ constexpr const char* systemDirectories[] = {"/usr", "/bin", "/sbin", "/lib", "/
 constexpr const char* ownDirectories[] = {"/proc", "/dev", memoryPlace, "/tmp"};
 
 // The system's containers are the daemon's, or the user's that owns them by name: an older system made them so.
-constexpr uid_t rootUser = 0;
+constexpr uid_t daemonUser = 0;
 
 std::unexpected<Failure> failed(std::string what, std::string advice) {
     return std::unexpected(Failure{.what = std::move(what), .advice = std::move(advice)});
@@ -126,7 +126,7 @@ public:
         if (::fstat(directory->get(), &status) != 0)
             return failed(withReason(what + " " + path + " cannot be read", zor::Errno::last()), advice);
         const bool owned =
-            users ? status.st_uid == options_.user : status.st_uid == rootUser || status.st_uid == systemUser_;
+            users ? status.st_uid == options_.user : status.st_uid == daemonUser || status.st_uid == systemUser_;
         if (!S_ISDIR(status.st_mode) || !owned)
             return failed(what + " " + path + " belongs to user " + std::to_string(status.st_uid) + ", not to " +
                               (users ? "user " + std::to_string(options_.user) : "the system"),

@@ -157,7 +157,7 @@ std::string shown(const zorvane::Value& value) {
                                                                                       : printable(*text);
     if (const auto* boolean = std::get_if<bool>(&value.content))
         return *boolean ? "yes" : "no";
-    return dumped(toJson(value), -1);
+    return dumped(zorvanectl::toJson(value), -1);
 }
 
 bool holdsMaps(const zorvane::List& list) {
