@@ -51,11 +51,14 @@ function(zor_use_pch target)
 endfunction()
 zor_precompile(zor_pch)
 
-# Sources that are compiled several at once take half the time. Tests always are, and the tool, whose libraries are all headers;
-# the rest of the product is where its tree is mostly built from nothing: under sanitizers and fuzzers. The other trees compile
-# each of its sources by itself, so that it includes what it needs.
-option(ZORVANE_TOGETHER "Compile the product's sources several at once too" OFF)
+# Sources that are compiled several at once take half the time. By default tests are, and the tool, whose libraries are all
+# headers; the rest of the product is where its tree is mostly built from nothing: under sanitizers and fuzzers. The other trees
+# compile each of its sources by itself, so that it includes what it needs. Lint wants each source by its own name.
+set(ZORVANE_TOGETHER tests CACHE STRING "Which sources are compiled several at once: none, tests, all")
 function(zor_compile_together target)
+    if(ZORVANE_TOGETHER STREQUAL none)
+        return()
+    endif()
     set_target_properties(${target} PROPERTIES UNITY_BUILD ON UNITY_BUILD_BATCH_SIZE 8)
     # gcc 12 is wrong about strings that are put together in an expression, as tests do; the clang builds have no such doubt.
     target_compile_options(${target} PRIVATE $<$<CXX_COMPILER_ID:GNU>:-Wno-array-bounds -Wno-restrict
@@ -81,7 +84,7 @@ function(zor_library name)
         return()
     endif()
     add_library(zor_${name} STATIC ${sources})
-    if(ZORVANE_TOGETHER)
+    if(ZORVANE_TOGETHER STREQUAL all)
         zor_compile_together(zor_${name})
     endif()
     zor_use_pch(zor_${name})
@@ -109,7 +112,7 @@ function(zor_program name)
         return()
     endif()
     add_executable(${name} ${sources})
-    if(ZORVANE_TOGETHER)
+    if(ZORVANE_TOGETHER STREQUAL all)
         zor_compile_together(${name})
     endif()
     zor_use_pch(${name})
