@@ -44,7 +44,7 @@ public:
     [[nodiscard]] Result<std::uint32_t> validateUserId(std::uint32_t requested, ContainerClass containerClass,
                                                        std::uint32_t clientUserId);
     /// The uid of the account "mobile", 0 when there is none. Looked up once, and again as long as it was not found: an
-    /// account can be added. Concurrent first callers wait for it.
+    /// account can be added. Callers that come while one looks wait for its answer.
     [[nodiscard]] std::uint32_t getCurrentMobileUserId();
 
 private:

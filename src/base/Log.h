@@ -62,8 +62,8 @@ public:
     LogRequestScope& operator=(const LogRequestScope&) = delete;
 };
 
-/// Whether a client that asks for what is not there, or for what it may not have, comes to this code on a healthy
-/// device.
+/// Whether this code also comes up on a healthy device: a client asks for a thing that is not there, or that it may not
+/// have.
 [[nodiscard]] bool isClientsMistake(ErrorCode code);
 
 inline constexpr int logLevelError = 3;
@@ -75,8 +75,8 @@ inline constexpr std::size_t shownBytesMax = 1024;
 
 class Log {
 public:
-    /// Decides whether a refusal provoked by a user id is written, which takes so many bytes in the log; may write the
-    /// line that says how many were not.
+    /// Decides whether the line of a refusal that a user id provoked, of so many bytes, is written; may write the line
+    /// that says how many were not.
     using RefusalGate = std::function<bool(std::uint32_t userId, std::size_t bytes)>;
 
     explicit Log(platform::PlatformLog& sink) : sink_(sink) {}

@@ -51,10 +51,10 @@ public:
         return domain_ == ErrorDomain::zor && code_ == static_cast<int>(code);
     }
     [[nodiscard]] bool isPosix(int number) const { return domain_ == ErrorDomain::posix && code_ == number; }
-    /// Whether its POSIX number, or that of what caused it, is one of those.
+    /// Whether its POSIX number, or its cause's, is a shortage of this process or system (platform/Errno.h).
     [[nodiscard]] bool isOwnShortage() const;
-    /// The number that a client gets as "ReplyError": the code, sign-extended from 32 bits. There 1 is success, so
-    /// EPERM leaves as EACCES.
+    /// The number that a client gets as "ReplyError": the code, sign-extended from 32 bits. EPERM leaves as EACCES, and
+    /// an errno whose number is one of the daemon's codes with 1000 added.
     [[nodiscard]] ErrorCode replyCode() const;
     /// For a line: domain, code and description, without the cause.
     [[nodiscard]] std::string text() const;
@@ -86,7 +86,8 @@ public:
     /// The same, with a copy of its cause; nullptr: there is none.
     ZORError error(CodeOfLine code, const ZORError* cause, const char* format, ...) const
         __attribute__((format(printf, 4, 5)));
-    /// One that a healthy device comes to all the time: whoever minds writes the line (logError).
+    /// The same without its line, for one that a healthy device meets all the time: a caller that minds it writes the
+    /// line (logError).
     [[nodiscard]] ZORError unlogged(CodeOfLine code, const char* format, ...) const
         __attribute__((format(printf, 3, 4)));
     void write(int level, const char* format, ...) const noexcept __attribute__((format(printf, 3, 4)));

@@ -16,7 +16,7 @@
 //
 // A mere reader of one identifier's container may do without a lock and find out afterwards whether anybody touched it
 // meanwhile: each writer is counted, before its first step, among those who touch an identifier, and once more when it
-// has let go. Whoever says nothing touches all; a holder says less only where it knows whose containers it changes.
+// has let go. A holder that says nothing touches all; it says less only where it knows whose containers it changes.
 //
 // Misuse (unlocking what is not locked) is said at level 3 and changes nothing.
 #pragma once
@@ -43,7 +43,7 @@ namespace zor {
 
 enum class LockMode { reading, writing };
 
-/// Identifiers share a count with those of the same hash: one in so many disturbs another in vain.
+/// Identifiers are counted in groups by their hash: a writer disturbs in vain the readers of one in so many others.
 inline constexpr std::size_t identifierGroupCount = 64;
 inline std::size_t identifierGroupOf(std::string_view identifier) {
     return std::hash<std::string_view>()(identifier) % identifierGroupCount;
@@ -89,9 +89,8 @@ public:
         ZOR_EXCLUDES(mutex_);
     void unlock_one_lock(std::string_view identifier) noexcept ZOR_EXCLUDES(mutex_);
 
-    /// While no writer touches `identifier`: a number that is another one after each who did. Twice the same one,
-    /// before and after a read, means that nobody touched it in between. nullopt while somebody does. Four atomic
-    /// reads.
+    /// A number that changes with every writer that touches `identifier`; nullopt while one does. The same number
+    /// before and after a read means that nobody touched the identifier in between. Four atomic reads.
     [[nodiscard]] std::optional<std::uint64_t> quietGeneration(std::string_view identifier) const noexcept;
 
     /// How many identifiers are locked or awaited, for tests and the status.
@@ -185,14 +184,15 @@ protected:
     ZORLocks& locks_;
 };
 
-/// The same for writing, and the proof of it. Its holder moves and makes files, for which a file system may wait: the
-/// threads that answer lookups are others meanwhile.
+/// The same for writing, and the proof of it. Its holder may wait for a file system, so the pool of threads lets
+/// another one run meanwhile.
 class AllIdentifiersWriteLock final : public AllIdentifiersLock {
 public:
     explicit AllIdentifiersWriteLock(ZORLocks& locks, Touches touches = Touches::anything())
         : AllIdentifiersLock(locks, LockMode::writing, touches) {}
 
-    /// Before the first step that changes those: lookups of theirs wait from then on.
+    /// Adds these identifiers to those touched, before the first step that changes them: lookups of them wait from then
+    /// on.
     void touch(Touches touches) const noexcept { locks_.touch(touches); }
 
 private:

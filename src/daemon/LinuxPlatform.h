@@ -41,8 +41,8 @@ public:
         ListenerLimits listenerLimits;
     };
 
-    /// Opens the root, makes the runtime directory, takes the daemon's lock, reads who owns containers and tells
-    /// clients; nothing is served yet. Else one line that says what stood in the way.
+    /// Opens the root, makes the runtime directory, takes the daemon's lock, reads which users own containers and
+    /// writes that down for clients; nothing is served yet. The error is one line that says what stood in the way.
     [[nodiscard]] static std::expected<std::unique_ptr<LinuxPlatform>, std::string> open(Options options);
     ~LinuxPlatform();
     LinuxPlatform(const LinuxPlatform&) = delete;
@@ -59,8 +59,8 @@ public:
     [[nodiscard]] RotatingLog& log() { return log_; }
     [[nodiscard]] PassedSockets& passedSockets() { return passed_; }
 
-    /// Stops the listener and finishes the queues: from then on nothing calls into what was built on the roles. To be
-    /// called before that goes.
+    /// Stops the listener and finishes the queues: from then on nothing calls into the objects that were built on the
+    /// roles. To be called before those go.
     void finish();
 
 private:

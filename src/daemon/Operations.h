@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // Every operation on the store, made once. A member may call those that stand above it, which it was given by
-// reference, and nothing else: the order of the members is the order of the house.
+// reference, and none below it.
 //
-// Alive as long as the composition that made it. The members that are no operations are the data that several share.
+// Lives as long as the composition that made it. The members that are no operations are the data that several share.
 #pragma once
 
 #include "base/ZORError.h"

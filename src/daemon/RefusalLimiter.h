@@ -24,7 +24,7 @@ public:
     using Clock = std::chrono::steady_clock;
     /// Told how many lines of one user, or of ipc::strangersUserId, were left out. Called without any lock held.
     using Report = std::function<void(uid_t uid, std::uint64_t linesLeftOut)>;
-    /// Has reportEnded called after that time, or earlier. Called without any lock held.
+    /// Sees to it that reportEnded is called after that time, or earlier. Called without any lock held.
     using Later = std::function<void(std::chrono::milliseconds delay)>;
 
     static constexpr unsigned linesPerSecondMax = 200;
@@ -35,7 +35,7 @@ public:
     RefusalLimiter(const ipc::UserNumbers& users, Report report, Later later,
                    std::function<Clock::time_point()> now = Clock::now);
 
-    /// Whether a line about `uid` is to be written now, which takes so many bytes in the log.
+    /// Whether a line about `uid`, of so many bytes, is to be written.
     [[nodiscard]] bool admit(uid_t uid, std::size_t bytes);
     /// Reports every count whose time is over.
     void reportEnded();

@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // The client of one message: who it is, what it may ask for, and the names under which it asks.
 //
-// One object a message; the daemon's own lives as long as the daemon. It does nothing itself: each name is that of an
-// operation, and its meaning, errors and locks are said there. Operations may be called from any thread; rights are
-// changed by the thread that serves the message.
+// Each message has one object; the daemon's own lives as long as the daemon. It does nothing itself: each name is that
+// of an operation, whose header says its meaning, errors and locks. Operations may be called from any thread; rights
+// are changed by the thread that serves the message.
 #pragma once
 
 #include "daemon/Operations.h"
@@ -34,7 +34,6 @@ public:
     using PreserveOldUUID = zor::PreserveOldUUID;
     using ReplaceRequest = zor::ReplaceRequest;
 
-    /// initWithBundleId:clientUserId:allowOtherIdLookup:entitledWipeIdentifiers:
     ZORClientConnection(Operations& operations, Client client) : operations_(operations), caller_(std::move(client)) {}
     ZORClientConnection(const ZORClientConnection&) = delete;
     ZORClientConnection& operator=(const ZORClientConnection&) = delete;

@@ -20,8 +20,8 @@
 
 namespace zor::fs {
 
-// The status of an item, out of what the kernel remembers of it: a file system that is not here, or that a user made,
-// is not asked, and so cannot make anybody wait. Any thread.
+// The status of an item as the kernel remembers it: a file system that another machine or a user serves is not asked,
+// and so cannot make anybody wait. Any thread.
 
 /// lstat of one name in an open directory. EXDEV where another file system, or another part of this one,
 /// is mounted on the name; `status` is then that of its root, as far as it is remembered (the type is).
@@ -44,9 +44,9 @@ Errno statusOfDescriptor(int descriptor, struct stat& status, MountIdentity& mou
 //
 // A fence is a directory: a user's home, or the place of containers that belong to the system. Below it no step of a
 // path crosses a mount, so the file system of a mount point there is never asked. The fence itself may lie on any
-// mount. That of a home is judged whenever it is another than before: a file system that a user serves (FUSE) is no
-// home, EXDEV; one that is not of this machine may stop answering. Such a home is asked on a thread of its own whether
-// it still answers, at most once in `answerHoldsMilliseconds`, and while it does not, all that leads there fails
+// mount. A home's mount is judged whenever it is another one than at the last look: a file system that a user serves
+// (FUSE) is no home, EXDEV; one that is not of this machine may stop answering. Such a home is asked on a thread of its
+// own whether it still answers, at most once in `homeAnswerHolds`, and while it does not, all that leads there fails
 // with EHOSTDOWN at once. A caller that is about to take a lock that others need asks anew. Not defended: a home that
 // stops answering between the question and the use holds the thread that is there.
 //

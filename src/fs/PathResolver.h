@@ -84,7 +84,7 @@ struct ParentAndName {
     std::string name;
 };
 
-/// Which directory it is, and of which mount: what lies at its path has changed when this has.
+/// Tells a directory and its mount from any other at the same path.
 struct DirectoryId {
     std::uint64_t device = 0;
     std::uint64_t inode = 0;

@@ -1,9 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 // Work that several threads share: numbered things, things as they are found, or the directories of a tree.
 //
-// Threads come to the caller's own where that pays, and have ended when a call returns; one that is not to be had is
-// not missed. A thread serves the caller at the caller's priority, or at the usual one where the caller's is higher. An
-// exception of any thread comes out on the caller's, after all have ended; then not everything need have been done.
+// Further threads help the caller's where that pays, and have ended when a call returns; without them the caller's does
+// all of the work. A thread serves the caller at the caller's priority, or at the usual one where the caller's is
+// higher. An exception of any thread comes out on the caller's, after all have ended; then not everything need have
+// been done.
 #pragma once
 
 #include "base/Mutex.h"
@@ -20,7 +21,7 @@
 
 namespace zor::fs {
 
-/// Threads beside the caller's. Any thread may add one, their own too; the maker ends them.
+/// Threads beside the caller's. Any thread may add one, each of them too; the thread that made the object ends them.
 class Helpers {
 public:
     explicit Helpers(std::size_t countMax) : countMax_(countMax) {}
@@ -28,7 +29,8 @@ public:
     Helpers& operator=(const Helpers&) = delete;
     ~Helpers() { join(); }
 
-    /// Does nothing where there are as many as may be, or no thread is to be had. `work` outlives them.
+    /// Starts a thread that calls `work`; nothing happens at the limit, or when the system gives none. `work` outlives
+    /// the threads.
     void add(const std::function<void()>& work);
     /// Waits for all, and throws on what one of them, or `run` at another thread, threw first.
     void finish();

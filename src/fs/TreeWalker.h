@@ -254,8 +254,8 @@ private:
 // Tells, in one walk of a tree, whether a file that has several names has one outside: when all its names have been
 // met, it has none.
 //
-// Meetings are counted. Whoever can rename in the tree during the walk can have one name met twice, so who asks sees to
-// it that nobody can, or that nobody gains by it. Memory grows with the files of which names are still to come.
+// Meetings are counted. A user who can rename in the tree during the walk can have one name met twice, so the caller
+// sees to it that nobody can, or that nobody gains by it. Memory grows with the files of which names are still to come.
 
 class NamesMet {
 public:

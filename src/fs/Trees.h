@@ -80,9 +80,8 @@ private:
 // Kept: data (shared with the source where the file system can), holes, mode, owner and group, access and modification
 // time, access control lists, extended attributes, symbolic links as links, FIFOs, hard links between files of the
 // tree. Not kept, on purpose:
-//   - set-user-ID and set-group-ID of files, and file capabilities: a copy must not bring a power to life a second
-//   time.
-//     (Directories keep set-group-ID: there it only says who inherits the group.)
+//   - set-user-ID and set-group-ID of files, and file capabilities: a copy must not bring a power to life a second time
+//     (directories keep set-group-ID, which only says who inherits the group).
 //   - sockets: their names mean nothing without the process that made them. They are skipped.
 //   - inode flags; attributes of links and FIFOs; attributes that the destination's file system does not have.
 //   - ownership and security labels when not run as root, as far as the kernel refuses them.

@@ -1,10 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 // The one place where the daemon creates, moves, copies, removes, lists, re-owns and measures directories.
 //
-// It has no state and no lock; any thread may call any operation. Paths are resolved anew by each call without
-// following a link (PathResolver), everything after that acts on descriptors: what a path names may change at any
-// moment, what a descriptor names may not. Failures are POSIX-domain errors that carry the words below and are not
-// logged here; whoever returns them to a client logs.
+// It keeps nothing but which warnings it has logged; any thread may call any operation. Each call resolves its paths
+// anew without following a link (PathResolver), and acts on descriptors from there on: a path may lead elsewhere at any
+// moment, a descriptor may not. Failures are POSIX-domain errors that name the item, and are not logged here; the
+// operation that returns one to a client logs it.
 //
 // A stop in the middle leaves: of a new directory, a sibling named "NAME.XXXXXX"; of a move across file systems, a
 // hidden ".zorvaned-copy-XXXXXX" beside the destination or where the source was. Neither is ever taken for the real
@@ -143,8 +143,8 @@ public:
     [[nodiscard]] bool itemDoesNotExistAtURL(const FileURL& url);
     /// Whether nothing is there, or no directory on the way, and nothing hides it. Silent.
     [[nodiscard]] bool itemIsGone(const FileURL& url) const;
-    /// Whether nothing is there; of an item below a directory that is open, for who asks of very many; `url` names it
-    /// in messages.
+    /// Whether nothing is there; of an item below a directory that is open, for callers that ask about very many; `url`
+    /// names it in messages.
     [[nodiscard]] bool itemDoesNotExistBelow(int directory, const char* relativePath, const FileURL& url);
 
     // Data protection.

@@ -86,7 +86,7 @@ inline Result<void> checkAddress(const Log& log, const char* function, const Con
                address.userId, address.uuid ? address.uuid->string().c_str() : "(null)",
                static_cast<long>(address.containerClass));
 }
-/// The cache's record of a checked address, whose lock is `held`. Error 21, logged under `function`, or 38.
+/// The cache's record of a checked address, whose lock is `held`. Error 21, logged under `function`, or the cache's.
 inline Result<std::shared_ptr<ZORMetadata>> knownContainer(const Log& log, ZORContainerCache& cache,
                                                            const char* function, const ContainerAddress& address,
                                                            const IdentifierLock& held) {

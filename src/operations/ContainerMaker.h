@@ -54,11 +54,10 @@ public:
         /// The class directory that it was moved into.
         platform::FileDescriptor classDirectory;
     };
-    /// Needs no lock, and is dear: the disk is waited for. Errors 6, 7, 34; or 9 when what was begun could not be moved
-    /// away.
+    /// Needs no lock, and waits for the disk. Errors 6, 7, 34; or 9 when what was begun could not be moved away.
     Result<Built> build(std::uint32_t userId, const std::string& identifier, ContainerClass containerClass);
-    /// Moves it into its class directory, and gives its place there. `homeGeneration`: of the home in which the
-    /// container was looked for and not found. Error 8; or 9 as above: it is not in staging any more, whatever happens.
+    /// Moves it into its class directory; the value is its place there. `homeGeneration`: of the home in which the
+    /// container was looked for and not found. Error 8; or 9 as above. It leaves staging, whatever happens.
     Result<Placed> putInPlace(const Built& built, bool transient, std::uint64_t homeGeneration);
     /// Moves one away that is not needed. One that cannot be moved is swept from staging at the next launch.
     void discard(const Built& built) noexcept;
@@ -73,8 +72,8 @@ private:
     const Needs needs_;
 };
 
-/// A container that is built before the lock is taken, for who finds under it that there is none. One that nobody has
-/// taken goes to death row.
+/// A container that is built before the lock is taken, for the case that the lookup under the lock finds none. A
+/// container that is left here goes to death row.
 class BuiltAhead {
 public:
     explicit BuiltAhead(ContainerMaker& maker) : maker_(maker) {}

@@ -30,9 +30,9 @@
 
 namespace zor {
 
-// Finding a live container while nobody writes: without the all-identifiers lock, and without making or changing
-// anything. Most lookups end here. Why such a lookup never answers from the middle of a writer stands in
-// docs/decisions/0008-lookups-without-the-lock.md.
+// Finding a live container without making or changing anything: while nobody writes without a lock, else once more
+// under the all-identifiers lock held for reading. Most lookups end here.
+// docs/decisions/0008-lookups-without-the-lock.md says why such a lookup never answers from the middle of a writer.
 
 /// The container as it is, on the disk and in the cache at one moment; nullopt when it is not there, or when anything
 /// about it is out of the ordinary: then only the lookup under the lock can tell. The caller holds no identifier lock.
@@ -78,9 +78,9 @@ public:
     Result<FoundContainer> createOrLookupContainerForUser(const Caller& caller, std::uint32_t userId,
                                                           const std::string* identifier, ContainerClass containerClass,
                                                           const CreateOrLookupOptions& options);
-    /// The same for who holds that lock; makeDurable is called on the result when the lock is released, before anybody
-    /// is told. Nothing: there is none, and `ahead` has to be built without the lock first. Also
-    /// ReplaceRecovery::metOneUnderWay.
+    /// The same for a caller that holds that lock, and calls makeDurable on the result after its release, before
+    /// anybody is told. nullopt: there is no container, and `ahead` has to be built without the lock first. Also the
+    /// error of ReplaceRecovery::metOneUnderWay.
     Result<std::optional<FoundContainer>>
     createOrLookupContainerForUser(const Caller& caller, std::uint32_t userId, const std::string* identifier,
                                    ContainerClass containerClass, const CreateOrLookupOptions& options,

@@ -53,7 +53,7 @@ public:
     DeathRow(const DeathRow&) = delete;
     DeathRow& operator=(const DeathRow&) = delete;
 
-    /// POSIX code of an item that is not the container that it lies in the place of.
+    /// POSIX code of an item that lies in a container's place and is not that container.
     static constexpr int notTheContainer = ESTALE;
 
     /// Moves an item away, never by a copy; a missing one is no failure. With `owner`, a directory of another
@@ -85,7 +85,7 @@ public:
                 paths.push_back(std::move(path));
         }
     };
-    /// The code of the last pass.
+    /// The items that the last pass left.
     [[nodiscard]] Left left() const ZOR_EXCLUDES(leftMutex_) {
         const platform::MutexLock held(leftMutex_);
         return left_;
@@ -97,7 +97,7 @@ private:
                         const platform::MutexLock& moving);
     /// `from` is open and holds the item.
     Result<void> condemnOnItsFileSystem(int from, const FileURL& url, std::optional<std::uint32_t> owner);
-    /// The same; for who cannot move it anywhere else.
+    /// The same beside the item itself, when it can be moved nowhere else.
     Result<void> hideBesideItself(int from, const FileURL& url, std::optional<std::uint32_t> owner);
     /// Whether an open directory may be what `owner` gave away.
     [[nodiscard]] static bool isOf(int directory, std::uint32_t owner);

@@ -24,7 +24,7 @@
 namespace zor {
 
 // One container leaves the store: it moves to death row, its mapping and its record go. Nothing is asked of what it was
-// registered for; that is the matter of who calls (Deletion, EntitlementChange, ZORGroupManager).
+// registered for; that is the callers' matter (Deletion, EntitlementChange, ZORGroupManager).
 //
 // A stop after the move leaves a mapping that points to nothing, which the next launch removes; the cache ends
 // with the process. Moves are on the disk before the caller hears of them. Any thread.
@@ -52,13 +52,13 @@ public:
     /// Stages one container for deletion; one that is not there is skipped. Errors 28 (not durable), 35 (another may
     /// come back in its place), 44 (it could not be looked for), 46, 40.
     Result<void> stage(const ContainerToGo& container);
-    /// The same for who holds the lock: `changed` gets the directories to be synced when it is released, before anybody
-    /// is told (conclude).
+    /// The same for a caller that holds the lock: `changed` gets the directories to be synced after its release, before
+    /// anybody is told (conclude).
     Result<void> stage(const ContainerToGo& container, std::vector<FileURL>& changed,
                        const AllIdentifiersWriteLock& lock);
 
-    // The steps of it, for who stages several.
-    /// ReplaceRecovery::undisturbed, for who takes the lock.
+    // The steps of it, for callers that stage several.
+    /// ReplaceRecovery::undisturbed, around a step that takes the lock.
     template <typename Step>
     auto undisturbed(Step&& step) {
         return needs_.recovery.undisturbed(std::forward<Step>(step));

@@ -6,9 +6,9 @@
 // settledTime before the walk, or in it. Two fills are not seen: one that pauses for longer than that, and one that
 // begins during the walk in what was walked before, below the container's own directory.
 //
-// The walk holds no lock: a lookup waits for every identifier lock, so a large container would stop all clients for as
-// long as it is walked. The container is looked up and opened under its lock, and walked on that descriptor; the result
-// is kept only if the lock, taken again, finds the same container at the same place. Any thread.
+// The walk holds no lock: a creation or deletion waits for every identifier lock, so a large container would stop those
+// of all clients for as long as it is walked. The container is looked up and opened under its lock, and walked on that
+// descriptor; the result is kept only if the lock, taken again, finds the same container at the same place. Any thread.
 #pragma once
 
 #include "base/ZORError.h"
@@ -22,7 +22,7 @@
 
 namespace zor {
 
-/// `error` is the code.
+/// The answer to a client; `bytes` counts when `error` is success.
 struct DiskUsageAnswer {
     std::uint64_t bytes = 0;
     ErrorCode error = ErrorCode::success;

@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// The effect of a change of one identifier's entitlements on the map and of the containers that hang on it.
+// The effect of a change of one identifier's entitlements on the map and on the containers that follow from it.
 //
 // A change is planned: the parts of the map that will differ, in the order in which they are stored, and what goes with
 // the old entitlements. Then the system container and the groups are released, while the map still holds those, so that

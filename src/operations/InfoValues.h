@@ -2,7 +2,7 @@
 // Info values and the record of one container, by its UUID.
 //
 // A change is one atomic replacement of the metadata file: a stop leaves the old file or the new one. Each operation
-// holds the container's lock; the overloads that take one are for who holds it already. Any thread.
+// holds the container's lock; the overloads that take a lock are for callers that hold it already. Any thread.
 #pragma once
 
 #include "base/ZORError.h"

@@ -11,8 +11,8 @@
 
 namespace zor {
 
-/// The results of the preparation without the lock, for the containers and places that were there then. Under the lock
-/// they count only when these are the same.
+/// The results of the preparation without the lock, for the containers and places that were there then. They count only
+/// when the lookup under the lock finds the same ones.
 struct Replace::Prepared {
     std::shared_ptr<ZORMetadata> oldRecord; // nullptr: none is replaced
     std::shared_ptr<ZORMetadata> newRecord; // nullptr: nothing could be prepared
@@ -75,7 +75,7 @@ struct Replace::Progress {
     }
 };
 
-/// In messages.
+/// The operation's name in messages.
 inline constexpr const char* replaceFunction = "replaceContainer";
 
 } // namespace zor

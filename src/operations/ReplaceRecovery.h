@@ -79,9 +79,10 @@ public:
             waiting_.awaitMoreThan(ended);
         }
     }
-    /// Whether an error of the functions below says that: nothing has been done.
+    /// Whether an error of the functions below says that a replace is under way: nothing has been done then.
     [[nodiscard]] static bool metOneUnderWay(const ZORError& error) { return error.isPosix(EINPROGRESS); }
-    /// The same without trying anything: for who holds a container's own lock alone.
+    /// That error while a container of this identifier is being replaced. For callers that hold a container's own lock
+    /// alone, too.
     [[nodiscard]] Result<void> refuseIfUnderWay(std::uint32_t userId, ContainerClass containerClass,
                                                 std::string_view identifier) const;
 

@@ -65,8 +65,8 @@ private:
 
 // Entries of a class directory that are no containers go to death row, at the first launch after a boot.
 //
-// The owner of a class directory can rename anything to a name in it. So only what belongs to the owner of its
-// containers goes; another's directory stays, and is said.
+// The owner of a class directory can rename anything to a name in it. So only entries of the owner of its containers
+// go; another's directory stays, and the log says so.
 //
 // Directories are read in batches: no number of entries is too large for the memory. Every step may be repeated. On the
 // thread that starts the daemon; entries are judged by several threads.

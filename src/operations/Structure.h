@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // Two repairs of a container: its standard subdirectories made again, and a new name for its directory. Neither gives a
-// directory away because it has a wanted name: the container and each subdirectory are judged on the descriptor used.
+// directory to a user for its name alone: the container and each subdirectory are judged on the descriptor used.
 //
 // A subdirectory that is made anew has the protection class that is recorded for the container; while the device is
 // locked, one that lock takes away cannot be given, and the repair fails.

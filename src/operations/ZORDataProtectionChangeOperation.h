@@ -7,8 +7,9 @@
 // one with several names that does not belong to the container's owner: he can make its names seem to be all inside.
 //
 // A pass holds the container's lock while it looks the container up and opens it, and again afterwards to see that the
-// directory which it walked lies in the container's place still, and to record the change; not in between, since every
-// lookup of any client waits for such locks. A wipe keeps path and UUID: only the directory itself tells it.
+// directory which it walked lies in the container's place still, and to record the change; not in between, since
+// creations and deletions of all clients wait for such locks. A wipe keeps path and UUID: only the directory itself
+// shows that there was one.
 //
 // A stop in the middle leaves some files changed, the directories of others not yet, and nothing recorded; the same
 // request, sent again, does the rest.
@@ -63,8 +64,8 @@ public:
     /// `wasLocked`: a pass met a locked device, and no retry was wanted.
     using CompletionBlock = std::function<void(bool wasLocked, const std::optional<ZORError>& error)>;
 
-    /// initWithContainerMetadata:newClass:retryingIfLocked:changeType:. The record is the operation's own: as the
-    /// container was when the change was asked for.
+    /// `dataContainerMetadata` is the operation's own: the container as it was when the change was asked for.
+    /// `operationType`: bits of protectionChange.
     ZORDataProtectionChangeOperation(const Needs& needs, std::shared_ptr<const ZORMetadata> dataContainerMetadata,
                                      std::int32_t newDataProtectionClass, RetryIfLocked retryIfLocked,
                                      std::int32_t operationType)

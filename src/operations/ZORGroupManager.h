@@ -47,15 +47,15 @@ public:
     ZORGroupManager(const ZORGroupManager&) = delete;
     ZORGroupManager& operator=(const ZORGroupManager&) = delete;
 
-    /// The containers of an identifier's groups (of the system groups for user 499), made where they are missing. A
-    /// group whose container cannot be had is left out. Takes the all-identifiers lock for writing. `identifier`
-    /// nullptr: error 11; 40.
+    /// The containers of an identifier's groups (of the system groups for the system's user), made where they are
+    /// missing. A group whose container cannot be had is left out. Takes the all-identifiers lock for writing.
+    /// `identifier` nullptr: error 11; 40.
     Result<Paths> groupContainerPathsForUser(std::uint32_t userId, const Caller& caller, const std::string* identifier);
     /// The application groups of an identifier. `identifier` nullptr: error 11; 40.
     Result<std::vector<std::string>> groupContainerIdentifiersForUser(std::uint32_t userId,
                                                                       const std::string* identifier);
 
-    /// For who is about to change the entitlements of an identifier, without a lock: has read what the next needs.
+    /// Reads what the next two operations need. Called without a lock, before entitlements of `identifier` change.
     void prepare(const std::string& identifier);
     /// Error metOneUnderWay while the container of a group of `identifier` is being replaced, whoever else refers to
     /// it.

@@ -1,10 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 // A question to a file system that may never answer, asked on a thread of its own so that nobody else waits for ever.
 //
-// One question at a time for an object: who comes while one is under way gets the answer to that, and while one has not
-// come back, others are told so at once. So a file system that is dead costs one thread, however often it is asked
-// about. The thread holds nothing but what the question brings along, which has to outlive nothing: it may still wait
-// when the process ends.
+// An object has one question at a time: a caller that comes while it is under way gets its answer, and once somebody
+// has waited for it in vain, all others are told so at once. So a file system that is dead costs one thread, however
+// often it is asked about. The thread holds nothing but what the question brings along, which refers to nothing that
+// may go: the thread may still wait when the process ends.
 #pragma once
 
 #include "base/Mutex.h"
@@ -24,7 +24,7 @@ namespace zor::platform {
 /// that a thread does not run says nothing of a file system.
 inline constexpr int beginFactor = 5;
 
-/// All questions of an object are the same one, so that one's answer is as good as another's.
+/// All questions of an object ask the same, so that one's answer is as good as another's.
 template <typename Answer>
 class BoundedQuestion {
 public:

@@ -1,9 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 // The two ways in which a change of a file shows: by the marks of the file itself, and by a notice from its directory;
-// and a clock for who looks at the marks now and then.
+// and a clock for code that looks at the marks now and then.
 //
-// A change within one tick of the kernel's clock (some milliseconds) leaves the marks as they are: whoever keeps a
-// file's content takes care that the file is older. Any thread; one reader of an inotify descriptor at a time.
+// Two changes within one tick of the kernel's clock (some milliseconds) leave the same marks: a caller that keeps a
+// file's content for as long as its marks stay sees to it that the file is older than that. Any thread; one reader of
+// an inotify descriptor at a time.
 #pragma once
 
 #include "platform/Errno.h"
@@ -55,8 +56,8 @@ struct FileStamp {
 /// Takes all pending events of a non-blocking inotify descriptor. True when `counts` accepted one of them.
 bool readInotify(int inotify, const std::function<bool(const inotify_event&, std::string_view name)>& counts);
 
-// The monotonic clock as the kernel's ticks move it on, a few milliseconds at a time: for who asks at every message
-// whether something is due. Costs no system call. Any thread.
+// The monotonic clock as the kernel's ticks move it on, a few milliseconds at a time: for code that asks at every
+// message whether something is due. Costs no system call. Any thread.
 
 [[nodiscard]] inline std::int64_t coarseMilliseconds() {
     timespec now{};

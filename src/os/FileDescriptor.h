@@ -66,7 +66,7 @@ private:
 /// to be asked, or where the kernel has no such call.
 [[nodiscard]] ErrnoOr<FileDescriptor> openBeneathRemembered(int directory, const char* relativePath, int flags);
 
-/// The same for a whole path, whose links are followed.
+/// The same for an absolute path, whose links are followed.
 [[nodiscard]] ErrnoOr<FileDescriptor> openRemembered(const char* path);
 
 /// The same as openBeneath for trees that only root writes to, such as DIR/etc: links are followed, as if `directory`
@@ -81,7 +81,7 @@ private:
 /// Everything from the descriptor's offset on. EFBIG when that is more than `bytesMax`, EINVAL when it is no regular
 /// file.
 [[nodiscard]] ErrnoOr<std::string> readSmallFile(int fd, std::size_t bytesMax);
-/// read(2) that no signal ends: the count.
+/// One read(2), begun again when a signal ends it: the bytes read, 0 at the end of the file.
 [[nodiscard]] ErrnoOr<std::size_t> readOnce(int fd, std::span<std::uint8_t> bytes);
 
 // The names in a directory that only root writes to. Any thread.
@@ -89,7 +89,7 @@ private:
 /// All names but "." and "..", sorted by their bytes; `directory` is a real descriptor, its offset is not used. An
 /// errno when not all could be read.
 [[nodiscard]] ErrnoOr<std::vector<std::string>> directoryNames(int directory);
-/// The same for who can do without: none when it cannot be read.
+/// The same for a caller that can do without the names: none when the directory cannot be read.
 [[nodiscard]] std::vector<std::string> directoryNamesIfAny(int directory);
 
 // Whether a directory shows what is in it. One that is encrypted by its file system, while its key is away, does not:

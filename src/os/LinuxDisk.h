@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: Apache-2.0
-// The real make of Disk: each method is its system call, nothing kept between calls. Any thread.
+// Disk on the real system: each method is its system call, nothing kept between calls. Any thread.
 #pragma once
 
 #include "os/FileDescriptor.h"

@@ -76,8 +76,8 @@ private:
     std::vector<std::function<void()>> posted_ ZOR_GUARDED_BY(mutex_);
 };
 
-/// Has a job done on the loop's thread a while later. The loop outlives it, and does not run when it goes, unless it
-/// goes on the loop's thread.
+/// Has a job done on the loop's thread a while later. The loop outlives the timer. The timer is destroyed on the loop's
+/// thread, or while the loop does not run.
 class LoopTimer {
 public:
     LoopTimer(RunLoop& loop, std::function<void()> job) : loop_(loop), timer_(loop.addTimer(std::move(job))) {}

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// A serial queue with one thread. A background queue's thread has less of the processors than others, and of the disk
-// what nobody else wants.
+// A serial queue with one thread. The thread of a queue of background priority has less of the processors than others
+// (nice 5), and of the disk only what nobody else wants.
 //
 // Destroying a queue waits for the running job and for all that are queued, including those that they queue; of a
 // queue that is suspended, or was never started, the queued jobs are dropped (destroyed without having run). No other
@@ -24,13 +24,13 @@ public:
     SerialWorkQueue(const SerialWorkQueue&) = delete;
     SerialWorkQueue& operator=(const SerialWorkQueue&) = delete;
 
-    /// Once more does nothing.
+    /// False when the system gives no thread. Once more does nothing.
     [[nodiscard]] bool start() override;
     void async(std::function<void()> job) override;
     // After a finish has begun neither has any effect.
     void suspend() override;
     void resume() override;
-    /// For whoever goes before the queue does, and is what the jobs act on. Not from a job.
+    /// Ends the queue as its destruction does, before the objects go that its jobs act on. Not from a job.
     void finish();
 
 private:

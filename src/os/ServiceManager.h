@@ -39,7 +39,7 @@ private:
 // It is used where the service manager has connected standard error to the journal. A journal that does not read loses
 // lines rather than holding up who writes them; the log file has them all. Any thread.
 
-/// The fields of a log line, and of the request that it belongs to.
+/// One log line. Its error and the request that it belongs to are the thread's own (LogSubject).
 struct JournalLine {
     int level = 0;
     std::string_view function;
@@ -68,14 +68,15 @@ private:
 class PassedSockets {
 public:
     PassedSockets() = default;
-    /// The sockets that the variables name; nothing when they are meant for another process or make no sense. The
-    /// descriptors are this object's from then on, those that nobody takes are closed with it, and no child inherits
-    /// them.
+    /// The values of LISTEN_PID, LISTEN_FDS and LISTEN_FDNAMES.
     struct Variables {
         std::string pid;
         std::string count;
         std::string names;
     };
+    /// The sockets that the variables name; none when they are meant for another process or make no sense. The
+    /// descriptors are this object's from then on, those that nobody takes are closed with it, and no child inherits
+    /// them.
     [[nodiscard]] static PassedSockets of(const Variables& variables, int firstDescriptor = 3);
     /// Those of this process's environment, which is cleared of them.
     [[nodiscard]] static PassedSockets ofEnvironment();

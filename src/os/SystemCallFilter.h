@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // Rules by which the kernel refuses system calls to a process and to all that it starts, for good.
 //
-// Rules hold in the order in which they were added; a call that meets none is decided by the rest. A call of another
-// architecture ends the process: it has other numbers, so no rule would know it. A rule compares the low half
+// The rule that was added first decides a call that meets several; `Rest` decides one that meets none. A call of
+// another architecture ends the process: it has other numbers, so no rule would know it. A rule compares the low half
 // of an argument: the kernel reads no more of the arguments named here. One thread.
 #pragma once
 

@@ -80,7 +80,7 @@ public:
     /// O_PATH | O_DIRECTORY.
     [[nodiscard]] int descriptor() const { return directory_.get(); }
     /// The true place of a path of the system: "/private/var" becomes DIR/private/var. A missing first slash is added,
-    /// so the names of Names.h can be given as they stand; "/" is the root itself.
+    /// so the names above can be given as they stand; "/" is the root itself.
     [[nodiscard]] std::string path(std::string_view systemPath) const;
 
     /// Makes run/zorvane (0755) where it is missing and opens it. EPERM when the directory belongs to

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // One client's connection. Objects are reused and live as long as the listener, so an event that is out of date finds
-// an object, and that the object tells it so.
+// an object, which finds that it is out of date.
 //
 // The kernel tells each arrival once. The worker that takes the event *holds* the connection until the kernel has
 // nothing more for it (also while it is requeued): it reads, serves and closes; nobody else does. An event that another

@@ -7,9 +7,8 @@
 // *active*.
 //
 // Invariants:
-//   - active workers are as many as may run at once (`running_`), except for moments in which one ends its wait and has
-//   not
-//     parked yet;
+//   - active workers are as many as may run at once (`running_`), except for moments in which one has ended its wait
+//     and has not parked yet;
 //   - whenever fewer are active than may run, at least one is waiting, or the pool has threadsMax threads: so work that
 //     arrives is always seen by somebody. A thread that makes "nobody waits" or "fewer are active" true looks at the
 //     other and adds a worker; both counters are sequentially consistent, so one of two that meet sees it;
@@ -55,7 +54,7 @@ public:
     ListenerPool(const ListenerPool&) = delete;
     ListenerPool& operator=(const ListenerPool&) = delete;
 
-    /// False when the system gives no epoll or not a single thread.
+    /// False when the system gives no epoll descriptor, or not a single thread.
     [[nodiscard]] bool start();
     /// Lets running tasks end, then joins all threads. Events that nobody took are lost. Not from a task.
     void stop();

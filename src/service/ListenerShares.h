@@ -37,7 +37,7 @@ namespace zor::platform {
 // share stands aside until one of its tasks has ended.
 //
 // Invariants: a task waits at most once. A line is in a ring exactly when tasks wait in it and it does not stand aside.
-// Everything is guarded by the pool's mutex but what says that it is not. Tasks and lines outlive their waiting.
+// The pool's mutex guards everything but the members that say otherwise. Tasks and lines outlive their waiting.
 
 struct ListenerScratch;
 class ListenerTask;
@@ -182,8 +182,8 @@ struct ListenerLimits {
     /// The same of all users that do not own the root together.
     std::size_t outputBytesMaxOfOthers = std::size_t{1} << 30;
 
-    /// Requests of one connection that are served in a row while nobody else waits, and for how long: who comes
-    /// meanwhile is not seen before the end. The first one may take any time.
+    /// Requests of one connection that are served in a row while nobody else waits, and for how long: another client is
+    /// not seen before the end. The first one may take any time.
     unsigned framesPerTurn = 16;
     std::chrono::microseconds turnMax{1000};
 

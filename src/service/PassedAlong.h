@@ -27,7 +27,7 @@ void refuseDescriptors(int listening);
 
 /// Lets the calling thread be interrupted. The signal for it does nothing else, and restarts what it can.
 void allowInterrupts();
-/// A thread of this process that allowed it, or has ended.
+/// Interrupts a thread of this process that allowed it; one that has ended is no harm.
 void interruptThread(pid_t threadId);
 
 /// While it lives the calling thread is interrupted again and again. Scopes do not nest.

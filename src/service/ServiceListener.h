@@ -5,9 +5,9 @@
 // and connections are bounded (ListenerShares.h); no peer can make a thread wait.
 //
 // ListenerSocket        who gets in                   ListenerConnection   one peer: frames in, replies out
-// ListenerPool          the threads, one epoll      ListenerInput/Output its buffers
+// ListenerPool          the threads, one epoll        ListenerInput/Output its buffers
 // ListenerTurns         whose turn it is
-// ListenerLimits        who may use how much        ListenerIncidents    what is counted and logged
+// ListenerLimits        who may use how much          ListenerIncidents    what is counted and logged
 // PassedAlong           descriptors sent by peers
 #pragma once
 
@@ -56,15 +56,15 @@ public:
     ServiceListener(const ServiceListener&) = delete;
     ServiceListener& operator=(const ServiceListener&) = delete;
 
-    /// Begins to accept and serve. Once. errno tells why when it is false; nobody can connect to a socket of its own
-    /// then.
+    /// Begins to accept and serve. Once. False, with errno, on failure; nobody can connect to a socket that the
+    /// listener made then.
     [[nodiscard]] bool resume(ServiceHandler handler);
     /// Stops accepting, ends every connection and joins the threads. Each connection that is still open gets its
     /// invalid event from the calling thread. Replies that come later go nowhere.
     void stop();
 
-    /// Whether the pool has taken the question of the last call; asks it anew. For one thread that calls it now and
-    /// then, between resume and stop.
+    /// Whether the pool has answered the question of the last call; asks a new one. For one thread that calls it now
+    /// and then, between resume and stop.
     [[nodiscard]] bool answers();
 
     /// All zero before resume. Any thread, but not during resume.

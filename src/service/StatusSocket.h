@@ -2,8 +2,8 @@
 // The status socket: whoever connects gets one reply frame (id 0) and the end of the stream. Nothing is read, so there
 // is no request that could go wrong, and a program that is refused everywhere else can ask why.
 //
-// Everything happens on the run loop's thread and never blocks it: of a reply that a new connection's buffer would not
-// take the brief form is sent.
+// Everything happens on the run loop's thread and never blocks it: the brief form of a reply is sent when a new
+// connection's buffer would not take the full one.
 #pragma once
 
 #include "os/RunLoop.h"

@@ -30,12 +30,12 @@ namespace zor {
 //
 // Homes come and go while the daemon runs: they are mounted late, unlocked at a login, made for a user who was added.
 // One that does not resolve is none for the moment, and is looked for again at each use. Every change of what was seen
-// gives a new generation, so that who keeps what was read below a home knows whether it still counts.
+// gives a new generation, by which a cache of things read below the home knows whether they count.
 //
 // Nothing here makes anything. The disk is asked without a lock, and not waited for without end; from the first look on
 // no way into the home crosses a mount. Any thread.
 
-/// Leads to a home's path without links, or to an error.
+/// The question for a home's path without links, asked where it may take for ever.
 using HomeQuestion = platform::BoundedQuestion<ErrnoOr<std::string>>;
 
 class UserHome {
@@ -114,7 +114,7 @@ struct UsableDirectory {
 
 class ZORPerUserConfiguration {
 public:
-    /// nullptr, with a log line, for who is no mobile user: `home` is null.
+    /// nullptr, with a log line, for a user who is no mobile user: `home` is null then.
     static std::unique_ptr<ZORPerUserConfiguration> initWithUserId(std::uint32_t userId, const Log& log,
                                                                    ZORFileManager& fileManager, UserHome* home);
 
@@ -168,11 +168,11 @@ public:
     /// The owners of containers; never changed.
     [[nodiscard]] const UserNumbers& users() const { return users_; }
 
-    /// The user's configuration, made at the first call; nullptr for who is none (tried and logged again each time).
-    /// Lives as long as this object.
+    /// The mobile user's configuration, made at the first call; nullptr for any other user (logged each time). Lives as
+    /// long as this object.
     ZORPerUserConfiguration* getPerUserConfigurationForUserId(std::uint32_t userId);
 
-    /// The home of a mobile user, or nullptr for who is none. No lock; lives as long as this object.
+    /// The home of a mobile user; nullptr for any other user. No lock; lives as long as this object.
     [[nodiscard]] UserHome* homeOf(std::uint32_t userId) const;
     /// Knows the homes of all mobile users, so that no way into one crosses a mount. A launch calls it before all else.
     void fenceHomes();
@@ -205,13 +205,13 @@ public:
     [[nodiscard]] FileURL temporaryDirectory() const { return places_.temporaryDirectory(); }
 
     /// Closes the home of the daemon's own directories to everybody else, where it is the daemon's, and makes it closed
-    /// where it is missing: what is staged or deleted is private. Whether it was open.
+    /// where it is missing: what is staged or deleted is private. True when it was open to others.
     Result<bool> closeHomeDirectory();
 
     /// The class directory, made if missing; absent only for a class or user that has none, or whose home is not there.
     std::optional<FileURL> containerDirectoryURLForUser(std::uint32_t userId, ContainerClass containerClass,
                                                         bool transient);
-    /// The same directory, open, for moving containers into it: with what it failed for, its URL is of use for messages
+    /// The same directory, open, for moving containers into it. If it could not be opened, its URL is for messages
     /// alone.
     std::optional<UsableDirectory> openClassDirectory(std::uint32_t userId, ContainerClass containerClass,
                                                       bool transient);

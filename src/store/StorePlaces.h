@@ -24,8 +24,8 @@
 
 namespace zor::names {
 
-// Every name that the store has on disk, spelled here (and, for those that the file manager knows too, in fs/Names.h)
-// and nowhere else.
+// Every name that the store has on disk, spelled here and nowhere else, but for the names that the file manager knows
+// too (fs/Names.h).
 
 // Fixed places, below the system root.
 inline constexpr std::string_view rootHome = "/private/var/root";
@@ -148,8 +148,8 @@ private:
     UUID uuid_;
 };
 
-// The things that a system root has to hold before a daemon can serve it, and which the daemon does not make: it
-// belongs to whoever builds the device. Immutable; any thread.
+// The things that a system root has to hold before a daemon can serve it, and which the daemon does not make: they
+// belong to the builder of the device. Immutable; any thread.
 
 struct RootDirectory {
     std::string_view path; // from the root, without a leading slash
@@ -166,8 +166,8 @@ inline constexpr std::array<RootDirectory, 4> rootDirectories = {{
     {"tmp", 01777, false},
 }};
 
-/// Those of them, and the user database, that are not there. An entry that cannot be looked at counts as there: the
-/// daemon says later what it failed on.
+/// The paths of these directories, and of the user database, that are not there. An entry that cannot be looked at
+/// counts as there: the daemon says later what it failed on.
 [[nodiscard]] std::vector<std::string> missingOf(const platform::SystemRoot& root);
 /// One line about them, with the command that makes them.
 [[nodiscard]] std::string lineAboutMissing(const platform::SystemRoot& root, const std::vector<std::string>& missing);
@@ -189,7 +189,7 @@ struct ContainerLayout {
 /// The layout of a valid class for a container of `userId`.
 [[nodiscard]] ContainerLayout layoutOf(ContainerClass containerClass, std::uint32_t userId);
 
-/// The user whose a container's directory is. Absent: nobody but root can put anything in its place.
+/// The owner of a container's directory. Absent: nobody but root can put anything in its place.
 [[nodiscard]] std::optional<std::uint32_t> topLevelOwnerOf(ContainerClass containerClass, std::uint32_t userId);
 
 } // namespace zor

@@ -48,7 +48,7 @@ namespace zor {
 
 struct StoreLimits {
     /// Containers of one user, transient ones and groups among them. A record takes some hundred bytes, 1.4 KB with the
-    /// longest identifier, so the ten users and the two owners stay below 2 GB at the very worst.
+    /// longest identifier, so ten users (the usual number) and the two owners stay below 2 GB at the very worst.
     std::size_t containersMaxPerUser = 100'000;
     /// Bytes of memory of the info values of one user's containers: those of one container may take a megabyte.
     std::size_t infoBytesMaxPerUser = std::size_t{64} << 20;
@@ -112,8 +112,8 @@ public:
                                         const std::string* identifier, bool transient);
 
     /// Reads what a lookup will need, where that has not been done, and asks a home that may stop answering whether it
-    /// does. For who takes the all-identifiers lock next, so that nobody waits there for this disk. The lookup tells
-    /// the failure, at once.
+    /// does. Called before the all-identifiers lock is taken, so that nobody waits there for this disk. The lookup
+    /// tells a failure, at once.
     void prepare(std::uint32_t userId, ContainerClass containerClass, bool transient) ZOR_EXCLUDES(cacheLock_);
     /// The same for a lookup by UUID: of transient containers only where there may be some.
     void prepare(std::uint32_t userId, ContainerClass containerClass) ZOR_EXCLUDES(cacheLock_);
@@ -165,8 +165,8 @@ private:
         auto operator<=>(const Key&) const = default;
     };
 
-    /// `whole` is for who is about to say that something is not there: the directory is read again when some of it was
-    /// hidden, and while that is so it is an error. The records that are known stay the same objects.
+    /// `whole` is for a caller that is about to say that something is not there: the directory is read again when some
+    /// of it was hidden, and while that is so it is an error. The records that are known stay the same objects.
     enum class Wanted { asKnown, whole };
     /// Reads what is missing for that. Returns with the class cache there, or an error.
     Result<ClassCache*> _getCacheForUserId(const Key& key, Wanted wanted = Wanted::asKnown) ZOR_REQUIRES(cacheLock_);

@@ -106,8 +106,8 @@ public:
     /// message.
     [[nodiscard]] bool callerRegistrationIsDue(const std::string& identifier, const plist::Dictionary& entitlements,
                                                const plist::Dictionary& options) ZOR_EXCLUDES(entitlementQueue_);
-    /// Another one after each change of what callerRegistrationIsDue tells of the identifier; never 0. An answer of it
-    /// holds while the generation is the one that was read before it was asked for. Two atomic reads.
+    /// A number that changes with each change of the answer of callerRegistrationIsDue for the identifier; never 0. An
+    /// answer holds while the number is the one that was read before the question. Two atomic reads.
     [[nodiscard]] std::uint64_t generation(std::string_view identifier) const {
         return generation_.load(std::memory_order_acquire) +
                generationOfGroup_[identifierGroupOf(identifier)].load(std::memory_order_acquire);
@@ -118,7 +118,7 @@ public:
     Result<void> _setEntitlementDictionaryValues(const std::vector<plist::Dictionary>& values,
                                                  const std::vector<std::string>& identifiers)
         ZOR_EXCLUDES(saving_, entitlementQueue_);
-    /// Unites what an older system kept with what is stored for an identifier: nothing of that goes. Error 59.
+    /// Adds what an older system kept to what is stored for an identifier, of which nothing goes. Error 59.
     Result<void> uniteEntitlements(const std::string& identifier, const plist::Dictionary& older)
         ZOR_EXCLUDES(saving_, entitlementQueue_);
 

@@ -41,9 +41,8 @@ public:
 
     [[nodiscard]] std::uint32_t uid() const { return uid_; }
     void setUid(std::uint32_t uid) { uid_ = uid; }
-    /// The internal UUID, which clients know; not the one in the directory's name.
-    /// A reader without the lock that guards it may get half of either, and sees the writer that gave it the other half
-    /// (ZORLocks::quietGeneration).
+    /// The internal UUID, which clients know; not the one in the directory's name. A reader without the lock that
+    /// guards it may get halves of two UUIDs, and then sees that a writer was there (ZORLocks::quietGeneration).
     [[nodiscard]] UUID uuid() const {
         const std::array<std::uint64_t, 2> halves{uuid_[0].load(std::memory_order_acquire),
                                                   uuid_[1].load(std::memory_order_acquire)};

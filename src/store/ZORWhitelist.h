@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // The system and system-group containers that lie at a fixed path: identifier to directory name.
 //
-// A table that an administrator made and that could not be read whole may have given names that nobody here knows of:
-// nothing is deleted, and nothing moved, on the word of what is left of it, or of the built-in one in its place.
+// An administrator's table that could not be read whole may have given names that are unknown here: nothing is deleted
+// or moved on the word of its readable rest, or of the built-in table in its place.
 //
 // Immutable after it is made; any thread.
 #pragma once
@@ -27,7 +27,7 @@ public:
         bool isWhole = true;
     };
 
-    /// initWithSystemContainerMapping:systemGroupContainerMapping:
+    /// The tables of the two classes, as they are.
     ZORWhitelist(Table systemContainers, Table systemGroupContainers)
         : system_(std::move(systemContainers)), systemGroup_(std::move(systemGroupContainers)) {}
     /// The tables of DIR/etc/zorvane/wellknown.plist where that file stands, else the built-in ones. A file that cannot

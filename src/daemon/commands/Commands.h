@@ -50,7 +50,8 @@ namespace zor::commands {
     return own ? &*own : nullptr;
 }
 
-/// The same for who may be fenced in to its own identifier. False, logged, for another one: the context has its error.
+/// Whether the client, which may be fenced in to its own identifier, may ask for this one. False, logged: the context
+/// has its error.
 [[nodiscard]] inline bool mayAskFor(CommandContext& context, const std::string* identifier) {
     const auto& own = context.client->clientBundleIdentifier();
     if (!context.client->onlyOwnIdentifier() || !identifier || (own && *identifier == *own))
