@@ -3,12 +3,13 @@
 //
 //     auto client = zorvane::Client::connect({});
 //     if (!client) … client.error().message …
-//     auto container = client->createOrLookup({.containerClass = 2, .identifier = "org.example.notes", .create =
-//     true});
+//     auto container = client->createOrLookup(
+//         {.containerClass = 2, .identifier = "org.example.notes", .create = true});
 //
 // A Client is one connection and is used by one thread at a time; programs that call from several threads make several.
 // Calls block until the answer is there or their time is over. After a transport error (any kind but daemon) the
-// connection is of no more use: connect again. The daemon's identity registry decides what a caller may do.
+// connection is of no more use: connect again. The daemon's identity registry decides what a caller may do. Any call
+// may fail with a code that errorText explains; comments name those that a program is likely to act on.
 #pragma once
 
 #include "zorvane/Error.h"
@@ -84,6 +85,7 @@ struct ListedContainer {
 
 class Client {
 public:
+    /// Connects to the daemon of a root. Fails with the kinds unreachable and timedOut.
     [[nodiscard]] static Result<Client> connect(const ConnectOptions& options);
     Client(Client&&) noexcept;
     Client& operator=(Client&&) noexcept;
@@ -102,15 +104,15 @@ public:
     /// Code 21: there is none, and it was not to be made.
     [[nodiscard]] Result<Container> createOrLookup(const Lookup& lookup);
 
-    /// One container, as list and createOrLookup name it.
+    /// One container, as list and createOrLookup name it. Calls about one fail with code 21 when it is not there.
     struct Address {
         std::uint64_t containerClass = 0;
         std::uint32_t user = currentMobileUser;
         std::string identifier;
         std::array<std::uint8_t, 16> uuid{};
     };
-    /// Takes containers out of the store; their files go when death row is emptied. Containers that are not there are
-    /// skipped.
+    /// Takes containers out of the store; their files go when death row is emptied. A container that is not there is
+    /// skipped, and is no error.
     [[nodiscard]] Result<void> stageForDelete(const std::vector<Address>& containers);
     /// The same for the one container of an identifier. Code 21: there is none.
     [[nodiscard]] Result<void> deleteContainer(std::uint64_t containerClass, std::uint32_t user,
@@ -149,7 +151,7 @@ public:
         std::string identifier;
         /// 0, 1, 3, or for the system's own programs another; never 2.
         std::int32_t protectionClass = 0;
-        /// The container is not one of the system's own programs.
+        /// The container is of no program of the system's own.
         bool thirdParty = false;
         /// Wait for the unlock of a locked device, and try again. The answer comes after that, so the call may take as
         /// long as the device stays locked.
@@ -161,13 +163,14 @@ public:
 
     // Shared containers. An empty identifier is the caller's own; paths are of containers that are made when they are
     // first asked for.
-    /// Group identifier to path.
+    /// From group identifier to path.
     using GroupPaths = std::map<std::string, std::string>;
     [[nodiscard]] Result<GroupPaths> groupContainerPaths(std::uint32_t user, const std::string& identifier);
     [[nodiscard]] Result<std::vector<std::string>> groupContainerIdentifiers(std::uint32_t user,
                                                                              const std::string& identifier);
     /// Code 55: the identifier is not entitled to one.
     [[nodiscard]] Result<std::string> systemContainerPath(const std::string& identifier);
+    /// The containers of the identifier's system groups.
     [[nodiscard]] Result<GroupPaths> systemGroupContainerPaths(const std::string& identifier);
     /// The containers that an identifier shares, or has of the system, in one exchange.
     struct SharedContainers {

@@ -69,7 +69,7 @@ enum {
 typedef struct zorvane_error {
     uint32_t kind;
     uint32_t reserved;
-    // The daemon's, or 0.
+    // The daemon's code, or 0.
     uint64_t code;
     // One sentence for people, without a full stop; cut where it is longer.
     char message[1024];
@@ -186,7 +186,7 @@ const char* zorvane_value_next_key(const zorvane_value* map, const char* key);
 //
 // Each returns NULL only when there is no memory; zorvane_call and zorvane_async_start report that, and arguments that
 // are not allowed: a missing string, an empty identifier, text that is no UTF-8, flags that the command does not have.
-// A request is used once.
+// A request is used once. The comment of a function begins with the items that the command's result has.
 
 enum {
     // Make the container when there is none.
@@ -195,20 +195,20 @@ enum {
     ZORVANE_TRANSIENT = 2,
     // The entitlements stand for an identifier that is not installed yet.
     ZORVANE_PLACEHOLDER = 4,
-    // The container is not one of the system's own programs.
+    // The container is of no program of the system's own.
     ZORVANE_THIRD_PARTY = 8,
     // Wait for the unlock of a device that is locked.
     ZORVANE_RETRY_IF_LOCKED = 16
 };
 
-// identifier, path, uuid, existed. Flags: ZORVANE_CREATE, ZORVANE_TRANSIENT. Without an identifier (NULL) the caller's
-// own. ZORVANE_NOT_FOUND: there is none, and it was not to be made.
+// identifier, path, uuid, existed. Finds a container. Flags: ZORVANE_CREATE, ZORVANE_TRANSIENT. Without an identifier
+// (NULL) the caller's own is meant. ZORVANE_NOT_FOUND: there is none, and it was not to be made.
 zorvane_request* zorvane_request_lookup(uint32_t container_class, uint32_t user, const char* identifier,
                                         uint32_t flags) ZORVANE_MUST_USE;
 // Entries with identifier and uuid, in no particular order. Flag: ZORVANE_TRANSIENT.
 zorvane_request* zorvane_request_list(uint32_t container_class, uint32_t user, uint32_t flags) ZORVANE_MUST_USE;
-// One page of the list, in the order of the identifiers' bytes: the first for NULL, then the one after what
-// zorvane_result_next_page said.
+// One page of the list, in the order of the identifiers' bytes. after: NULL for the first page, then the text that
+// zorvane_result_next_page gave for the page before.
 zorvane_request* zorvane_request_list_page(uint32_t container_class, uint32_t user, uint32_t flags,
                                            const char* after) ZORVANE_MUST_USE;
 // Takes a container out of the store; its files go when death row is emptied. Flag: ZORVANE_TRANSIENT.
