@@ -102,7 +102,7 @@ enum class Load { light, heavy };
 class BlockingObserver {
 public:
     virtual ~BlockingObserver() = default;
-    // They do not fail: who opens a scope may have counted himself already as one that waits.
+    // They do not fail: a thread that opens a scope may have counted itself already as one that waits.
     virtual void willBlock(Load load) noexcept = 0;
     virtual void didBlock() noexcept = 0;
 

@@ -42,8 +42,8 @@ public:
     [[nodiscard]] ZORFileManager& defaultManager() { return fileManager_; }
     [[nodiscard]] ZORGlobalConfiguration& configuration() { return configuration_; }
 
-    // Made when they are first asked for: reading the entitlement file belongs to the start of the work, after the log
-    // is open. Not before the log is; the first call is made by the thread that starts the daemon.
+    // Made when they are first asked for, which is after the log is open: reading the entitlement file belongs to the
+    // start of the work. The thread that starts the daemon makes the first call.
     [[nodiscard]] Operations& store();
     [[nodiscard]] Dispatcher& dispatcher();
     [[nodiscard]] UpcallServer& upcallServer();

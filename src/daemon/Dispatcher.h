@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
-// The table of the commands, and the way of every message: is the command one, who sends it, may it be sent, then the
-// handler and the reply.
+// The table of the commands, and the way of every message: whether there is such a command, who sends it, whether that
+// client may, then the handler and the reply.
 //
 // A message that is refused ends its connection without a reply. The dispatcher holds no lock and keeps nothing of a
 // peer between messages. Messages of one connection come one at a time, those of different ones in parallel.

@@ -14,7 +14,7 @@ struct DaemonOptions {
     bool foreground = false;
     int logLevel = 5;
     bool forgetBoot = false;
-    /// One user's; see StoreLimits.
+    /// Containers that one user may have; see StoreLimits.
     std::optional<std::size_t> containersPerUser;
 };
 

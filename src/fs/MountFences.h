@@ -81,7 +81,7 @@ public:
     [[nodiscard]] std::string_view path() const { return judgement_->path; }
     /// Whether the relative path is the fence's directory, or lies below it.
     [[nodiscard]] bool holds(std::string_view path) const;
-    /// How much of such a path may lie on any mount: of system places, up to the class directory.
+    /// How many bytes of such a path may lie on any mount: in a system place, those up to the class directory.
     [[nodiscard]] std::size_t ownBytes(std::string_view path) const;
 
     /// Whether the home answers; false after `homePatience` at the latest. Costs nothing for a home on a local disk.

@@ -86,9 +86,9 @@ public:
     Result<FileURL> createTemporaryDirectoryInDirectoryURL(const FileURL& directory);
 
     // Removal, copy, move.
-    /// Asked often by what may take long. After the answer false it ends with ECANCELED, as soon as what it leaves is
-    /// whole or hidden: the source of a copy stays, and what was copied is a leftover. A copy that has its name is a
-    /// success, and what is left of its source a leftover.
+    /// Asked often by calls that may take long. After the answer false the call ends with ECANCELED, as soon as all
+    /// that it leaves is whole or hidden: the source of a copy stays, and what was copied is a leftover. A copy that
+    /// has its name is a success, and what is left of its source a leftover.
     using GoOn = std::function<bool()>;
     /// Removes a tree; what is missing is not missed. An item that cannot be removed lets the rest go and is the error.
     /// An immutable or append-only item is made mutable and removed. Absent URL: EFAULT.

@@ -62,9 +62,9 @@ public:
                                           std::optional<std::uint32_t> owner = std::nullopt);
 
     enum class Row : std::uint8_t { ofRoot, ofFileSystem, besideItself };
-    /// Moves an item to `destination` on root's death row, where that is another file system to the row of its own, and
-    /// where neither can be out of sight beside itself, with a pass queued. Errors are of the system, or
-    /// notTheContainer, and not logged.
+    /// Moves an item to `destination` on root's death row; from another file system to the row of that one; when
+    /// neither can take it, out of sight beside itself, with a pass queued. The value says which. Errors are of the
+    /// system, or notTheContainer, and not logged.
     Result<Row> condemn(const FileURL& url, const FileURL& destination, std::optional<std::uint32_t> owner);
 
     /// Queues one deletion pass; the completion runs on the death-row queue with success or the pass's last error code.

@@ -4,10 +4,10 @@
 //
 // The kernel tells each arrival once. The worker that takes the event *holds* the connection until the kernel has
 // nothing more for it (also while it is requeued): it reads, serves and closes; nobody else does. An event that another
-// worker takes meanwhile is left to the holder, who looks again before it lets go. That bytes came short of what there
-// was room for tells nothing: those of another sender may wait behind them, and no event comes for those any more. So
-// the holder receives until it finds nothing, unless its event told of an arrival alone and the kernel says, with the
-// bytes, that none wait behind them: an end of the stream that is no news any more was in the event.
+// worker takes meanwhile is left to the holder, who looks again before it lets go. A receive that brings fewer bytes
+// than there is room for does not mean that none are left: bytes of another sender may wait behind them, of which no
+// further event tells. So the holder receives until it finds nothing, unless its event told of an arrival alone (not of
+// an end of the stream) and the kernel says, with the bytes, that none wait behind them.
 //
 // Replies may be sent by any thread at any time. While some are unsent, the connection waits for room as well: the
 // holder sees to that when it lets go, and with no holder the thread that sent.

@@ -229,7 +229,7 @@ public:
         Account(bool isOwners, unsigned threadsMax) : ownsRoot(isOwners), line(isOwners, threadsMax) {}
 
         const bool ownsRoot;
-        /// The mutex does not guard it.
+        /// Not guarded by the mutex of the charges.
         ListenerLine line;
         std::size_t connections = 0;
         std::size_t inputBytes = 0;

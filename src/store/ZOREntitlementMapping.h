@@ -8,7 +8,8 @@
 // it is saved when the caller has let its locks go. Readers see each change whole, or not yet.
 //
 // Changes are numbered as they are applied, and one save takes along all that have been applied when it begins: the
-// others' savers find that done. Nobody is told of a change before it is saved, also not of one that is there already.
+// others' savers find that done. No client is told of a change before it is saved, not even one that asks for what
+// another client's unsaved change has stored already.
 //
 // A stop during a save leaves the old file or the new one. A file that is there but cannot be read is moved aside
 // before anything is saved: as long as it lies there, nothing may be deleted because the map does not mention it
