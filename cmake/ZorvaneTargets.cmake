@@ -9,7 +9,7 @@ add_library(zor_options INTERFACE)
 target_compile_options(zor_options INTERFACE
     -Wall -Wextra -Wpedantic -Wnon-virtual-dtor -Woverloaded-virtual -Wformat=2 -Wundef
     -fno-omit-frame-pointer -fstack-protector-strong
-    # Of sources compiled together, one may hide a name that only another has; lint judges them all with this warning.
+    # One of several sources compiled together may hide a name that only another has; lint judges each with this warning.
     $<$<NOT:$<BOOL:$<TARGET_PROPERTY:UNITY_BUILD>>>:-Wshadow>
     # TRY is a statement expression; both compilers have them, and no standard form can return from the caller. This clang
     # finds a use of something deprecated inside this library's own stable_sort; gcc still says where ours do.
@@ -28,8 +28,8 @@ target_include_directories(zor_options INTERFACE ${CMAKE_SOURCE_DIR}/src)
 set(CMAKE_POSITION_INDEPENDENT_CODE OFF)
 target_compile_options(zor_options INTERFACE -fPIC)
 
-# Half of a translation unit's time went into the headers of libraries. tools/house.py looks whether sources include what they
-# use of those.
+# The headers of libraries take half of the time that a translation unit takes without this. tools/house.py looks whether
+# sources include those that they use.
 # zor_precompile(name LINK ... HEADERS ...): the standard headers and these, for the targets of this folder from here on.
 option(ZORVANE_PCH "Precompile the headers of libraries" ON)
 macro(zor_precompile name)

@@ -79,7 +79,7 @@ def run(command):
 
 
 def stamp_of(path, source):
-    """What the verdict depends on, or nothing when the headers cannot be listed."""
+    """A digest of all that the verdict depends on, or nothing when the headers cannot be listed."""
     listed, rule = run(["clang++-19", *source.flags, "-M", str(path)])
     if not listed:
         return None
@@ -96,7 +96,7 @@ def write_batch(batch, path):
 
 
 def judge(batch, work):
-    """A text of what was found, and the stamps of what was clean. Of a batch with faults the first are told."""
+    """A text of the faults that were found, the first ones of a batch, and the stamps of all that was clean."""
     path = batch[0].path
     if len(batch) > 1:
         path = work / (hashlib.sha256(" ".join(source.name for source in batch).encode()).hexdigest()[:16] + ".cc")

@@ -1,8 +1,8 @@
 #!/bin/sh
 # SPDX-License-Identifier: Apache-2.0
 # Installs the client library below PLACE and builds against it what others build: with pkg-config and with CMake, in each
-# standard that it promises. What is built lies in PLACE/bin, the library in PLACE/lib. Also sees that the library exports what its header declares
-# and its Debian package promises.
+# standard that it promises. The build lies in PLACE/bin, the library in PLACE/lib. Also sees that the library exports what its
+# header declares and its Debian package promises.
 # usage: consumers.sh SOURCES BUILD PLACE
 set -eu
 sources="$1" build="$2" place="$3"
