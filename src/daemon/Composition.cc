@@ -23,11 +23,12 @@ void Composition::sayLeftOut(uid_t uid, std::uint64_t lines) const {
 }
 
 Composition::Late::Late(Composition& composition)
-    : operations({{composition.log_, composition.boundary_, composition.locks_, composition.cache_},
-                  composition.fileManager_,
-                  composition.durability_,
-                  composition.configuration_},
-                 composition.platform_),
+    : operations(
+          {{composition.log_, composition.boundary_, composition.locks_, composition.cache_, composition.replaces_},
+           composition.fileManager_,
+           composition.durability_,
+           composition.configuration_},
+          composition.platform_),
       sharedClientConnection(std::make_shared<ZORClientConnection>(operations, Caller::daemonItself())),
       dispatcher(composition.log_, composition.users_, operations),
       upcallServer(composition.upcallNeeds(operations), composition.platform_.upcallPort) {}
@@ -78,7 +79,8 @@ Operations::Operations(const Store& store, const platform::Platform& platform)
                 store.durability,
                 store.configuration,
                 {platform.transactions, platform.deathRowQueue}}),
-      recovery({store.log, store.fileManager, store.configuration, store.cache, moves, deathRow, setup}),
+      recovery(
+          {store.log, store.fileManager, store.configuration, store.cache, moves, deathRow, setup, store.replaces}),
       maker({store.log, store.fileManager, store.durability, store.configuration, whitelist, deathRow}),
       creation({store, store.configuration, entitlements, limits, moves, deathRow, recovery, maker}),
       removal({store, store.fileManager, store.configuration, moves, mappings, deathRow, recovery}),

@@ -19,6 +19,7 @@
 #include "fs/ZORFileManager.h"
 #include "os/RunLoop.h"
 #include "store/Configuration.h"
+#include "store/ReplaceJournal.h"
 #include "store/ZORContainerCache.h"
 #include "store/ZORWhitelist.h"
 #include "upcall/UpcallServer.h"
@@ -73,6 +74,7 @@ private:
     fs::Durability durability_;
     ZORGlobalConfiguration configuration_;
     ZORContainerCache cache_;
+    WaitingReplaces replaces_;
 
     struct Late {
         explicit Late(Composition& composition);

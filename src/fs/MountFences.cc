@@ -193,15 +193,21 @@ bool MountFence::answers(Asked asked) {
             (asked == Asked::lately && std::chrono::steady_clock::now() - judgement_->answeredAt < homeAnswerHolds))
             return true;
         isJudged = judgement_->kind != MountKind::unknown;
-        // The question may outlive this object, and whoever made it.
-        if (!judgement_->ownRoot.valid())
-            judgement_->ownRoot.reset(::fcntl(judgement_->root, F_DUPFD_CLOEXEC, 0));
     }
     // A home that the kernel remembers is judged without a question to anybody; most are of this machine.
     if (!isJudged) {
         const auto home = platform::openBeneathRemembered(judgement_->root, judgement_->path.c_str(), pathFlags);
         if (home && judgement_->judge(home->get()) == MountKind::local)
             return true;
+    }
+    {
+        const MutexLock held(judgement_->mutex);
+        // The question may outlive this object, and whoever made it. A descriptor that is there is not changed any
+        // more: the question reads it without the mutex.
+        if (!judgement_->ownRoot.valid())
+            judgement_->ownRoot.reset(::fcntl(judgement_->root, F_DUPFD_CLOEXEC, 0));
+        if (!judgement_->ownRoot.valid())
+            return false; // nobody can be asked
     }
     if (question_.ask([judgement = judgement_] { return judgement->ask(); }, homePatience))
         return true;

@@ -10,6 +10,7 @@
 #include "ipc/Identifiers.h"
 #include "platform/Errno.h"
 #include "platform/Process.h"
+#include "store/ReplaceJournal.h"
 #include "store/ZORContainerCache.h"
 
 #include <cstdint>
@@ -30,6 +31,7 @@ struct RecordNeeds {
     ExceptionBoundary& boundary;
     ZORLocks& locks;
     ZORContainerCache& cache;
+    WaitingReplaces& replaces;
 };
 
 // Work that nobody waits for: a queue, and the marks by which the daemon counts as busy while something is on it.
@@ -86,17 +88,22 @@ inline Result<void> checkAddress(const Log& log, const char* function, const Con
                address.userId, address.uuid ? address.uuid->string().c_str() : "(null)",
                static_cast<long>(address.containerClass));
 }
-/// The cache's record of a checked address, whose lock is `held`. Error 21, logged under `function`, or the cache's.
-inline Result<std::shared_ptr<ZORMetadata>> knownContainer(const Log& log, ZORContainerCache& cache,
-                                                           const char* function, const ContainerAddress& address,
+/// The cache's record of a checked address, whose lock is `held`. Error 21, logged under `function`, or the cache's;
+/// WaitingReplaces::metOneUnderWay, for between its moves a replace has no live container, and has done with the info
+/// of the one that is to be.
+inline Result<std::shared_ptr<ZORMetadata>> knownContainer(const RecordNeeds& needs, const char* function,
+                                                           const ContainerAddress& address,
                                                            const IdentifierLock& held) {
     const std::string uuid = address.uuid->string();
     ZOR_ASSERT(held.identifier() == uuid);
-    auto record = TRY(cache.containerForUser(address.userId, address.containerClass,
-                                             address.identifier ? &*address.identifier : nullptr, uuid));
+    auto record = TRY(needs.cache.containerForUser(address.userId, address.containerClass,
+                                                   address.identifier ? &*address.identifier : nullptr, uuid));
+    if (record || address.identifier)
+        TRY(needs.replaces.refuseIfUnderWay(address.userId, address.containerClass,
+                                            record ? record->identifier() : *address.identifier));
     if (record)
         return record;
-    return Reporter(log, function)
+    return Reporter(needs.log, function)
         .error(ErrorCode::notFound, "No Container with userId: %u UUID: %s, identifier: %s, Class: %ld", address.userId,
                uuid.c_str(), ZOR_SHOWN(address.identifier), static_cast<long>(address.containerClass));
 }

@@ -88,7 +88,7 @@ Result<void> Creation::checkRequest(const Caller& caller, std::uint32_t userId, 
 
 Result<std::optional<FoundContainer>> Creation::lookedFor(const Wanted& wanted,
                                                           std::optional<ContainerMaker::Built>& built) {
-    return needs_.recovery.undisturbed([&] {
+    return needs_.replaces.undisturbed([&] {
         needs_.cache.prepare(wanted.userId, wanted.containerClass, wanted.options.transient);
         if (wanted.options.createIfNecessary && !wanted.caller.ownsRoot())
             (void)needs_.cache.heldByUser(wanted.userId);

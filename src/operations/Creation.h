@@ -80,7 +80,7 @@ public:
                                                           const CreateOrLookupOptions& options);
     /// The same for a caller that holds that lock, and calls makeDurable on the result after its release, before
     /// anybody is told. nullopt: there is no container, and `ahead` has to be built without the lock first. Also the
-    /// error of ReplaceRecovery::metOneUnderWay.
+    /// error of WaitingReplaces::metOneUnderWay.
     Result<std::optional<FoundContainer>>
     createOrLookupContainerForUser(const Caller& caller, std::uint32_t userId, const std::string* identifier,
                                    ContainerClass containerClass, const CreateOrLookupOptions& options,

@@ -19,7 +19,7 @@ Result<void> ContainerRemoval::stage(const ContainerToGo& container) {
     return needs_.boundary.run({deletionFunction, __LINE__}, [&]() -> Result<void> {
         std::vector<FileURL> changed;
         needs_.cache.prepare(container.userId, container.containerClass);
-        auto staged = needs_.recovery.undisturbed([&] {
+        auto staged = needs_.replaces.undisturbed([&] {
             const AllIdentifiersWriteLock lock(needs_.locks, Touches::nothing());
             return stage(container, changed, lock);
         });
@@ -141,7 +141,7 @@ Result<void> Deletion::stageForDeleteContainersWithUsers(const DeletionBatch& ba
         for (std::size_t index = 0; index < count && index < batch.users.size(); ++index)
             prepare(batch, index);
         while (progress.next < count) {
-            auto staged = needs_.removal.undisturbed([&] {
+            auto staged = needs_.replaces.undisturbed([&] {
                 const AllIdentifiersWriteLock lock(needs_.locks, Touches::nothing());
                 return stageNext(batch, progress, lock);
             });

@@ -58,15 +58,6 @@ public:
                        const AllIdentifiersWriteLock& lock);
 
     // The steps of it, for callers that stage several.
-    /// ReplaceRecovery::undisturbed, around a step that takes the lock.
-    template <typename Step>
-    auto undisturbed(Step&& step) {
-        return needs_.recovery.undisturbed(std::forward<Step>(step));
-    }
-    [[nodiscard]] Result<void> refuseIfUnderWay(std::uint32_t userId, ContainerClass containerClass,
-                                                const std::string& identifier) const {
-        return needs_.recovery.refuseIfUnderWay(userId, containerClass, identifier);
-    }
     /// The record; nullptr when there is none.
     Result<std::shared_ptr<ZORMetadata>> find(const ContainerToGo& container, const AllIdentifiersWriteLock& lock);
     /// `changed` gets the directories to be synced.

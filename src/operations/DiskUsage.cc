@@ -40,7 +40,7 @@ void DiskUsage::keepDiskUsage(const Caller& caller, const ContainerAddress& addr
         return;
     const plist::Value value(bytes);
     const auto kept = needs_.infoValues.setInfoValue(caller, &value, &staticDiskUsageKey, address, lock);
-    if (!kept)
+    if (!kept && !WaitingReplaces::metOneUnderWay(kept.error()))
         needs_.log.write(logLevelError, measurementFunction,
                          "Error setting info value for userId: %u, identifier: %s, Class: %llu: %llu", address.userId,
                          ZOR_SHOWN(address.identifier), static_cast<unsigned long long>(address.containerClass),
@@ -54,7 +54,7 @@ Result<std::uint64_t> DiskUsage::diskUsage(const Caller& caller, const Container
     fs::OpenResult directory = Errno(ENOENT);
     {
         const IdentifierWriteLock lock(needs_.locks, address.lockName(), Touches::nothing());
-        const auto record = TRY(knownContainer(needs_.log, needs_.cache, measurementFunction, address, lock));
+        const auto record = TRY(knownContainer(needs_, measurementFunction, address, lock));
         isKept = isBundleClass(address.containerClass) && !record->transient();
         if (isKept)
             if (const auto kept = keptDiskUsage(*record))
@@ -80,8 +80,9 @@ Result<std::uint64_t> DiskUsage::diskUsage(const Caller& caller, const Container
 }
 
 DiskUsageAnswer DiskUsage::diskUsageForUserId(const Caller& caller, const ContainerAddress& address) {
-    const auto measured = needs_.boundary.run({measurementFunction, __LINE__},
-                                              [&]() -> Result<std::uint64_t> { return diskUsage(caller, address); });
+    const auto measured = needs_.boundary.run({measurementFunction, __LINE__}, [&] {
+        return needs_.replaces.undisturbed([&] { return diskUsage(caller, address); });
+    });
     if (measured)
         return {.bytes = *measured};
     return {.bytes = 0, .error = measured.error().replyCode()};

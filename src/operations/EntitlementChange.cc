@@ -59,7 +59,7 @@ ErrorCode EntitlementChange::processEntitlements(const plist::Dictionary* entitl
             return ErrorCode::success;
         prepare(*identifier);
         std::optional<Change> change;
-        TRY(needs_.removal.undisturbed([&] {
+        TRY(needs_.replaces.undisturbed([&] {
             const AllIdentifiersWriteLock lock(needs_.locks, Touches::nothing());
             return process(entitlements, *identifier, options, change, lock);
         }));
@@ -114,8 +114,8 @@ Result<void> EntitlementChange::removeEntitlementDictionariesForIdentifierAndIts
 
 Result<void> EntitlementChange::refuseIfUnderWay(const std::string& identifier, const AllIdentifiersWriteLock& lock) {
     if (needs_.entitlements.identifierHasSystemContainer(identifier))
-        TRY(needs_.removal.refuseIfUnderWay(needs_.configuration.users().system, ContainerClass::dataSystem,
-                                            identifier));
+        TRY(needs_.replaces.refuseIfUnderWay(needs_.configuration.users().system, ContainerClass::dataSystem,
+                                             identifier));
     return needs_.groups.refuseIfUnderWay(identifier, lock);
 }
 
@@ -174,7 +174,7 @@ Result<void> EntitlementChange::releaseSystemContainer(const std::string& identi
     const Reporter report(needs_.log, processFunction);
     const std::uint32_t user = needs_.configuration.users().system;
     // Between its moves a replace has no live container.
-    TRY(needs_.removal.refuseIfUnderWay(user, ContainerClass::dataSystem, identifier));
+    TRY(needs_.replaces.refuseIfUnderWay(user, ContainerClass::dataSystem, identifier));
     const auto record = needs_.cache.containerForUser(user, ContainerClass::dataSystem, &identifier, false);
     if (!record) {
         report.write(logLevelError, "Failed to retrieve system container %s: %s", ZOR_SHOWN(identifier),

@@ -53,7 +53,7 @@ public:
     void prepareRemoval(const std::string& identifier);
     /// Removes what is stored for an identifier and for the children recorded for it. `change` gets the last change
     /// that is to be settled when the lock is released (settleRemoval). Failures are logged; an error only where
-    /// ReplaceRecovery::metOneUnderWay: nothing has been done then.
+    /// WaitingReplaces::metOneUnderWay: nothing has been done then.
     Result<void> removeEntitlementDictionariesForIdentifierAndItsChildren(const std::string& identifier,
                                                                           std::optional<Change>& change,
                                                                           const AllIdentifiersWriteLock& lock);
@@ -69,7 +69,7 @@ private:
     /// Error metOneUnderWay while something that goes with the entitlements of `identifier` is being replaced.
     [[nodiscard]] Result<void> refuseIfUnderWay(const std::string& identifier, const AllIdentifiersWriteLock& lock);
     void sayIfNotCleared(const std::string& identifier, ErrorCode code) const;
-    /// `change` gets what is to be settled, if anything is. An error of ReplaceRecovery::metOneUnderWay comes before
+    /// `change` gets what is to be settled, if anything is. An error of WaitingReplaces::metOneUnderWay comes before
     /// the map is changed; containers may have gone that the map still speaks of.
     Result<void> process(const plist::Dictionary* entitlements, const std::string& identifier,
                          const plist::Dictionary* options, std::optional<Change>& change,

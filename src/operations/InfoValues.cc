@@ -52,8 +52,10 @@ Result<void> InfoValues::setInfoValue(const Caller& caller, const plist::Value* 
                                       const ContainerAddress& address) {
     return needs_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
         TRY(checkSet(key, address));
-        const IdentifierWriteLock lock(needs_.locks, address.lockName(), Touches::nothing());
-        return set(caller, value, *key, address, lock);
+        return needs_.replaces.undisturbed([&] {
+            const IdentifierWriteLock lock(needs_.locks, address.lockName(), Touches::nothing());
+            return set(caller, value, *key, address, lock);
+        });
     });
 }
 
@@ -67,7 +69,7 @@ Result<void> InfoValues::setInfoValue(const Caller& caller, const plist::Value* 
 
 Result<void> InfoValues::set(const Caller& caller, const plist::Value* value, const std::string& key,
                              const ContainerAddress& address, const IdentifierWriteLock& held) {
-    const auto record = TRY(knownContainer(needs_.log, needs_.cache, setFunction, address, held));
+    const auto record = TRY(knownContainer(needs_, setFunction, address, held));
     plist::Dictionary info = record->info() ? *record->info() : plist::Dictionary();
     if (value)
         info.set(key, *value);
@@ -105,8 +107,10 @@ Result<void> InfoValues::checkGet(const std::string* key, const ContainerAddress
 Result<plist::Value> InfoValues::infoValueForKey(const std::string* key, const ContainerAddress& address) {
     return needs_.boundary.run(ZOR_HERE, [&]() -> Result<plist::Value> {
         TRY(checkGet(key, address));
-        const IdentifierLock lock(needs_.locks, address.lockName(), LockMode::reading);
-        return get(*key, address, lock);
+        return needs_.replaces.undisturbed([&] {
+            const IdentifierLock lock(needs_.locks, address.lockName(), LockMode::reading);
+            return get(*key, address, lock);
+        });
     });
 }
 
@@ -120,7 +124,7 @@ Result<plist::Value> InfoValues::infoValueForKey(const std::string* key, const C
 
 Result<plist::Value> InfoValues::get(const std::string& key, const ContainerAddress& address,
                                      const IdentifierLock& held) {
-    const auto record = TRY(knownContainer(needs_.log, needs_.cache, getFunction, address, held));
+    const auto record = TRY(knownContainer(needs_, getFunction, address, held));
     const plist::Value* value = record->info() ? record->info()->find(key) : nullptr;
     if (!value)
         return Reporter(needs_.log, getFunction)
@@ -132,10 +136,12 @@ Result<ContainerMetadata> InfoValues::metadataForUser(const ContainerAddress& ad
     return needs_.boundary.run(ZOR_HERE, [&]() -> Result<ContainerMetadata> {
         constexpr const char* function = "metadataForUser";
         TRY(checkAddress(needs_.log, function, address));
-        const IdentifierLock lock(needs_.locks, address.lockName(), LockMode::reading);
-        const auto record = TRY(knownContainer(needs_.log, needs_.cache, function, address, lock));
-        return ContainerMetadata{
-            .path = record->url().path(), .transient = record->transient(), .info = record->info()};
+        return needs_.replaces.undisturbed([&]() -> Result<ContainerMetadata> {
+            const IdentifierLock lock(needs_.locks, address.lockName(), LockMode::reading);
+            const auto record = TRY(knownContainer(needs_, function, address, lock));
+            return ContainerMetadata{
+                .path = record->url().path(), .transient = record->transient(), .info = record->info()};
+        });
     });
 }
 

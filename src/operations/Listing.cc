@@ -27,9 +27,12 @@ Result<std::vector<ListedContainer>> Listing::containersForUser(std::uint32_t us
                                                                 bool transient) {
     return needs_.boundary.run(ZOR_HERE, [&]() -> Result<std::vector<ListedContainer>> {
         TRY(checkListedClass(userId, containerClass));
-        needs_.cache.prepare(userId, containerClass, transient);
-        const AllIdentifiersLock lock(needs_.locks, LockMode::reading);
-        return listed(TRY(needs_.cache.allContainersForUser(userId, containerClass, transient)));
+        return needs_.replaces.undisturbed([&]() -> Result<std::vector<ListedContainer>> {
+            needs_.cache.prepare(userId, containerClass, transient);
+            const AllIdentifiersLock lock(needs_.locks, LockMode::reading);
+            TRY(needs_.replaces.refuseIfUnderWay(userId, containerClass));
+            return listed(TRY(needs_.cache.allContainersForUser(userId, containerClass, transient)));
+        });
     });
 }
 
@@ -37,11 +40,14 @@ Result<ListedPage> Listing::containersForUser(std::uint32_t userId, ContainerCla
                                               const std::string& after) {
     return needs_.boundary.run(ZOR_HERE, [&]() -> Result<ListedPage> {
         TRY(checkListedClass(userId, containerClass));
-        needs_.cache.prepare(userId, containerClass, transient);
-        const AllIdentifiersLock lock(needs_.locks, LockMode::reading);
-        auto page = TRY(needs_.cache.pageOfContainersForUser(userId, containerClass, transient,
-                                                             {after, needs_.limits.listPageMax}));
-        return ListedPage{.containers = listed(page.records), .next = std::move(page.next)};
+        return needs_.replaces.undisturbed([&]() -> Result<ListedPage> {
+            needs_.cache.prepare(userId, containerClass, transient);
+            const AllIdentifiersLock lock(needs_.locks, LockMode::reading);
+            TRY(needs_.replaces.refuseIfUnderWay(userId, containerClass));
+            auto page = TRY(needs_.cache.pageOfContainersForUser(userId, containerClass, transient,
+                                                                 {after, needs_.limits.listPageMax}));
+            return ListedPage{.containers = listed(page.records), .next = std::move(page.next)};
+        });
     });
 }
 

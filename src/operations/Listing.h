@@ -1,5 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // Listing the containers of a class. Changes nothing. Any thread; under the all-identifiers lock held for reading.
+// A listing waits for a replace under way in its class: between its moves the class lacks a live container.
 #pragma once
 
 #include "base/ContainerClass.h"

@@ -36,7 +36,7 @@ Result<void> Replace::replaceContainer(const ReplaceRequest& request, StartDelet
         bool mayExchange = true;
         for (int round = 0;; ++round) {
             Progress progress;
-            auto result = needs_.recovery.undisturbed([&] {
+            auto result = needs_.replaces.undisturbed([&] {
                 progress = Progress();
                 return replaceOnce(request, progress, mayExchange, startDeletionThread);
             });
@@ -129,7 +129,7 @@ Result<void> Replace::recoveringFromExceptions(Progress& progress, Step&& step) 
 
 void Replace::endUnderWay(Progress& progress, WaitingReplaces::Ended how) noexcept {
     if (std::exchange(progress.isUnderWay, false))
-        needs_.recovery.underWay().end(progress.prepared.journalUrl, how);
+        needs_.replaces.end(progress.prepared.journalUrl, how);
 }
 
 Result<void> Replace::begin(const ReplaceRequest& request, Progress& progress, const AllIdentifiersWriteLock& lock) {

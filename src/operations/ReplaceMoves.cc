@@ -60,14 +60,13 @@ Result<void> Replace::moveOldAway(const ReplaceRequest& request, Progress& progr
     const fs::Durability& durability = needs_.moves.durability();
     progress.newMovesLater = !durability.keepsOrder(waiting, directories.dest.get());
     if (progress.newMovesLater || !durability.keepsOrder(directories.dest.get(), prepared.journals.get())) {
-        needs_.recovery.underWay().begin(
-            {.journalUrl = prepared.journalUrl,
-             .oldUrl = progress.oldUrl,
-             .destUrl = progress.destUrl,
-             .waitingUrl = prepared.journal.asideUrl},
-            {.userId = request.userIdNew,
-             .containerClass = request.classNew,
-             .identifiers = {progress.oldRecord->identifier(), progress.newRecord->identifier()}});
+        needs_.replaces.begin({.journalUrl = prepared.journalUrl,
+                               .oldUrl = progress.oldUrl,
+                               .destUrl = progress.destUrl,
+                               .waitingUrl = prepared.journal.asideUrl},
+                              {.userId = request.userIdNew,
+                               .containerClass = request.classNew,
+                               .identifiers = {progress.oldRecord->identifier(), progress.newRecord->identifier()}});
         progress.isUnderWay = true;
     }
     progress.waitingUrl = prepared.journal.waitingUrl();

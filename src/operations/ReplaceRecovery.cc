@@ -93,19 +93,24 @@ const State* stateOf(ZORFileManager& fileManager, const ReplaceJournal& journal)
     return found == std::end(states) ? nullptr : found;
 }
 
+WaitingReplaces::Waiting waitingOf(const FileURL& journalUrl, const ReplaceJournal& journal) {
+    return {
+        .journalUrl = journalUrl, .oldUrl = journal.oldUrl, .destUrl = journal.destUrl, .waitingUrl = journal.asideUrl};
+}
+
 } // namespace
 
 Result<void> ReplaceRecovery::_recoverFromReplaceOperationsWithError() {
     // Until all of them have been looked at, whoever asks for what one may name lists them again: want of memory, or a
     // stop, may end this anywhere.
-    waiting_.setUnlisted(true);
+    needs_.waiting.setUnlisted(true);
     const FileURL replace = needs_.configuration.replaceDirectory();
     const auto items = needs_.fileManager.urlsForItemsInDirectoryAtURL(replace);
     if (!items) {
         if (!items.error().isPosix(ENOENT))
             needs_.log.write(logLevelError, recoverFunction, "Failed to get items at replace URL%s : %s",
                              replace.c_str(), items.error().text().c_str());
-        waiting_.setUnlisted(!items.error().isPosix(ENOENT));
+        needs_.waiting.setUnlisted(!items.error().isPosix(ENOENT));
         return {};
     }
     // A journal has its name for itself alone, so no later write removes what a stop left of this one's.
@@ -126,12 +131,9 @@ Result<void> ReplaceRecovery::_recoverFromReplaceOperationsWithError() {
                 stopped = std::move(recovered).error();
         // Found again by the next launch; until then whoever asks for what it names tries.
         if (unreadable || stopped)
-            waiting_.add({.journalUrl = item,
-                          .oldUrl = journal ? journal->oldUrl : FileURL(),
-                          .destUrl = journal ? journal->destUrl : FileURL(),
-                          .waitingUrl = journal ? journal->asideUrl : FileURL()});
+            needs_.waiting.add(journal ? waitingOf(item, *journal) : WaitingReplaces::Waiting{.journalUrl = item});
     }
-    waiting_.setUnlisted(false);
+    needs_.waiting.setUnlisted(false);
     if (stopped)
         return std::move(*stopped);
     return unread ? Result<void>(std::move(*unread)) : Result<void>();
@@ -190,7 +192,7 @@ Result<void> ReplaceRecovery::recoverReplace(const FileURL& journalUrl, const Re
     if (const auto moved = needs_.deathRow._moveItemAtURLToDeathRow(journalUrl, StartDeletionThread::no); !moved)
         return report.error(ErrorCode::replaceCleanUpFailed, &moved.error(), "Failed to remove replace file at %s",
                             journalUrl.c_str());
-    waiting_.remove(journalUrl);
+    needs_.waiting.remove(journalUrl);
     return {};
 }
 
@@ -280,23 +282,42 @@ bool ReplaceRecovery::mayComeBack(const FileURL& staged, const WaitingReplaces::
     return ::geteuid() != 0 || status.st_uid == (owner == ownerUnchanged ? ::geteuid() : owner);
 }
 
-Result<void> ReplaceRecovery::refuseIfUnderWay(std::uint32_t userId, ContainerClass containerClass,
-                                               std::string_view identifier) const {
-    if (!waiting_.isUnderWay(userId, containerClass, identifier))
-        return {};
-    return posixError(ZOR_HERE, Errno(EINPROGRESS), "a replace of %s is under way", ZOR_SHOWN(std::string(identifier)));
+bool ReplaceRecovery::mayBeAside(std::string_view name, const ContainerAtStake& atStake) {
+    for (const bool transient : {false, true}) {
+        const auto place =
+            needs_.configuration.containerDirectoryURLForUser(atStake.userId, atStake.containerClass, transient);
+        if (!place)
+            return true; // a home that cannot be looked for tells nothing
+        const auto top = fs::topOfMount(needs_.fileManager.resolver(), *place);
+        const auto aside = top ? fs::openAside(top->directory.get()) : fs::OpenResult(top.error());
+        if (!aside && (isOwnShortage(aside.error()) || aside.error() == EIO))
+            return true;
+        bool mayBe = false;
+        const auto look = [&](int, const FileURL& item) {
+            mayBe = (name.empty() || item.lastPathComponent() == name) && mayComeBack(item, {}, atStake);
+            return !mayBe;
+        };
+        if (aside && !needs_.fileManager.forEachItemIn(aside->get(), fs::asideBelow(top->url),
+                                                       ZORFileManager::Leftovers::shown, look))
+            return true;
+        if (mayBe)
+            return true;
+    }
+    return false;
 }
 
 Result<bool> ReplaceRecovery::settleReplaces(const ContainerAtStake& atStake, const AllIdentifiersWriteLock& lock) {
-    TRY(refuseIfUnderWay(atStake.userId, atStake.containerClass, atStake.identifier));
-    if (waiting_.none())
+    TRY(needs_.waiting.refuseIfUnderWay(atStake.userId, atStake.containerClass, atStake.identifier));
+    if (needs_.waiting.none())
         return false;
-    if (waiting_.unlisted())
+    if (needs_.waiting.unlisted())
         TRY(listReplacesAgain(atStake));
     bool settled = false;
     // A replace may be of two identifiers, and all class caches are dropped.
     lock.touch(Touches::anything());
-    for (const WaitingReplaces::Waiting& one : waiting_.all()) {
+    for (WaitingReplaces::Waiting one : needs_.waiting.all()) {
+        if (one.oldUrl.empty())
+            TRY(learnPlaces(one, atStake));
         const FileURL staged = one.waitingUrl.empty() ? needs_.configuration.stagingDirectory().appendingDirectory(
                                                             ReplaceJournal::stagingNameFor(one.journalUrl))
                                                       : one.waitingUrl;
@@ -317,18 +338,31 @@ Result<bool> ReplaceRecovery::settleReplaces(const ContainerAtStake& atStake, co
     return settled;
 }
 
+Result<void> ReplaceRecovery::learnPlaces(WaitingReplaces::Waiting& one, const ContainerAtStake& atStake) {
+    const auto journal = readJournal(one.journalUrl);
+    if (journal) {
+        one = waitingOf(one.journalUrl, *journal);
+        needs_.waiting.add(one);
+        return {};
+    }
+    const bool mayBeAtStake = ReplaceJournal::mayStillBeRead(journal.error()) &&
+                              mayBeAside(ReplaceJournal::stagingNameFor(one.journalUrl), atStake);
+    return mayBeAtStake ? Result<void>(journal.error()) : Result<void>();
+}
+
 Result<void> ReplaceRecovery::listReplacesAgain(const ContainerAtStake& atStake) {
     const auto journals = needs_.fileManager.urlsForItemsInDirectoryAtURL(needs_.configuration.replaceDirectory());
     if (journals) {
         for (const FileURL& url : *journals)
-            waiting_.add({.journalUrl = url});
-        waiting_.setUnlisted(false);
+            needs_.waiting.add({.journalUrl = url});
+        needs_.waiting.setUnlisted(false);
         return {};
     }
     const FileURL staging = needs_.configuration.stagingDirectory();
     const auto staged = needs_.fileManager.urlsForItemsInDirectoryAtURL(staging);
     const bool mayBeOne =
-        !staged || std::ranges::any_of(*staged, [&](const FileURL& url) { return mayComeBack(url, {}, atStake); });
+        !staged || std::ranges::any_of(*staged, [&](const FileURL& url) { return mayComeBack(url, {}, atStake); }) ||
+        mayBeAside("", atStake);
     if (!mayBeOne)
         return {};
     return Reporter(needs_.log, "settleReplaces")

@@ -47,6 +47,7 @@ public:
         const LastingMoves& moves;
         DeathRow& deathRow;
         SetupReport& report;
+        WaitingReplaces& waiting;
     };
     explicit ReplaceRecovery(const Needs& needs) : needs_(needs) {}
     ReplaceRecovery(const ReplaceRecovery&) = delete;
@@ -62,29 +63,9 @@ public:
     std::uint64_t sweepAside(const std::set<std::string, std::less<>>& kept);
 
     /// Whether no replace waits; costs one load.
-    [[nodiscard]] bool noneWaits() const { return waiting_.none(); }
+    [[nodiscard]] bool noneWaits() const { return needs_.waiting.none(); }
     /// The journal of a replace stays on the disk, for a later try.
-    void leave(WaitingReplaces::Waiting waiting) { waiting_.add(std::move(waiting)); }
-    /// For replaces that wait for the disk without the lock.
-    [[nodiscard]] WaitingReplaces& underWay() { return waiting_; }
-    /// Runs `step`, which takes the lock, until it meets no replace that is under way and has to do with its container:
-    /// before it comes again, that one has ended. Without a lock.
-    template <typename Step>
-    auto undisturbed(Step&& step) -> decltype(step()) {
-        for (;;) {
-            const std::uint64_t ended = waiting_.ended();
-            auto result = step();
-            if (result || !metOneUnderWay(result.error()))
-                return result;
-            waiting_.awaitMoreThan(ended);
-        }
-    }
-    /// Whether an error of the functions below says that a replace is under way: nothing has been done then.
-    [[nodiscard]] static bool metOneUnderWay(const ZORError& error) { return error.isPosix(EINPROGRESS); }
-    /// That error while a container of this identifier is being replaced. For callers that hold a container's own lock
-    /// alone, too.
-    [[nodiscard]] Result<void> refuseIfUnderWay(std::uint32_t userId, ContainerClass containerClass,
-                                                std::string_view identifier) const;
+    void leave(WaitingReplaces::Waiting waiting) { needs_.waiting.add(std::move(waiting)); }
 
     /// A container that is about to be made, or taken from its place.
     struct ContainerAtStake {
@@ -94,9 +75,10 @@ public:
         FileURL place; // empty when it has none
     };
     /// Tries the replaces that wait and that could bring back a container of this identifier, or one to this place.
-    /// Whether there were any; error 35 while one is left; metOneUnderWay.
+    /// Whether there were any; error 35 while one is left; WaitingReplaces::metOneUnderWay.
     Result<bool> settleReplaces(const ContainerAtStake& atStake, const AllIdentifiersWriteLock& lock);
-    /// The cache's record, or nullptr, when no replace that waits has to do with it. Error 35; metOneUnderWay.
+    /// The cache's record, or nullptr, when no replace that waits has to do with it. Error 35;
+    /// WaitingReplaces::metOneUnderWay.
     Result<std::shared_ptr<ZORMetadata>> settledContainer(std::uint32_t userId, ContainerClass containerClass,
                                                           const std::string* identifier, const UUID& uuid,
                                                           const AllIdentifiersWriteLock& lock);
@@ -104,6 +86,12 @@ public:
 private:
     /// For journals that could not be listed. Error 35 while they cannot and staging may hold a container at stake.
     Result<void> listReplacesAgain(const ContainerAtStake& atStake);
+    /// Reads a journal that could not be read before. Error 35 while it cannot be and names something aside that may be
+    /// at stake.
+    Result<void> learnPlaces(WaitingReplaces::Waiting& one, const ContainerAtStake& atStake);
+    /// Whether a container at stake may lie aside on the file system of its class directory, where that is not
+    /// staging's: under this name or, if that is empty, any.
+    bool mayBeAside(std::string_view name, const ContainerAtStake& atStake);
     /// Whether what waits at `staged` may be one of this identifier, or come back to this place.
     bool mayComeBack(const FileURL& staged, const WaitingReplaces::Waiting& waiting, const ContainerAtStake& atStake);
     /// The places that it names are below the root as it is, wherever that was when the journal was written.
@@ -113,7 +101,6 @@ private:
     Result<void> applyReplaceJournal(const ReplaceJournal& journal);
 
     const Needs needs_;
-    WaitingReplaces waiting_;
 };
 
 } // namespace zor

@@ -20,13 +20,16 @@ Result<void> Structure::recreateDefaultStructureForUser(const ContainerAddress& 
         constexpr const char* function = "recreateDefaultStructureForUser";
         TRY(checkAddress(needs_.log, function, address));
         std::vector<FileURL> changed;
-        {
+        const auto structure = needs_.replaces.undisturbed([&]() -> Result<void> {
             const IdentifierWriteLock lock(needs_.locks, address.lockName(), Touches::nothing());
-            const auto record = TRY(knownContainer(needs_.log, needs_.cache, function, address, lock));
-            changed.push_back(record->url());
+            const auto record = TRY(knownContainer(needs_, function, address, lock));
+            changed = {record->url()};
             TRY(makeSubdirectories(layoutOf(address.containerClass, address.userId),
                                    record->recordedProtectionClass().value_or(protectionClassUnchanged), changed));
-        }
+            return {};
+        });
+        if (!structure)
+            return structure;
         if (const auto failed = needs_.moves.syncDirectories(changed))
             return Reporter(needs_.log, function)
                 .error(ErrorCode::subdirectoryFailed, &*failed, "Failed to create sub-dir at %s%s",
@@ -70,7 +73,7 @@ Result<void> Structure::makeSubdirectories(const ContainerLayout& layout, int pr
 Result<void> Structure::regenerateDirectoryUUIDForUser(const ContainerAddress& address) {
     return needs_.boundary.run(ZOR_HERE, [&]() -> Result<void> {
         TRY(checkAddress(needs_.log, regenerateFunction, address));
-        return needs_.recovery.undisturbed([&] { return regenerate(address); });
+        return needs_.replaces.undisturbed([&] { return regenerate(address); });
     });
 }
 
@@ -86,8 +89,7 @@ Result<void> Structure::regenerate(const ContainerAddress& address) {
     }
     {
         const IdentifierWriteLock lock(needs_.locks, address.lockName());
-        const auto record = TRY(knownContainer(needs_.log, needs_.cache, function, address, lock));
-        TRY(needs_.recovery.refuseIfUnderWay(address.userId, address.containerClass, record->identifier()));
+        const auto record = TRY(knownContainer(needs_, function, address, lock));
         const FileURL oldUrl = record->url();
         const FileURL place = oldUrl.deletingLastPathComponent();
         newUrl = place.appendingDirectory(UUID::random().string());

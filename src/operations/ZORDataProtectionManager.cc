@@ -200,15 +200,20 @@ Result<std::shared_ptr<const ZORMetadata>> ZORDataProtectionManager::containerOf
     if (!request.identifier || !isPerUserClass(request.containerClass))
         return report.error(ErrorCode::invalidObject, "Can't act on an invalid object: userId: %u, ID: %s, class: %ld",
                             request.userId, ZOR_SHOWN(request.identifier), static_cast<long>(request.containerClass));
+    return needs_.replaces.undisturbed([&] { return copyOfRecord(request); });
+}
+
+Result<std::shared_ptr<const ZORMetadata>> ZORDataProtectionManager::copyOfRecord(const Request& request) {
     needs_.cache.prepare(request.userId, request.containerClass, false);
     // Records are shared: what this change goes by is copied while nobody can change it.
     const AllIdentifiersLock lock(needs_.locks, LockMode::reading);
+    TRY(needs_.replaces.refuseIfUnderWay(request.userId, request.containerClass, *request.identifier));
     const auto record =
         needs_.cache.containerForUser(request.userId, request.containerClass, &*request.identifier, false);
     if (!record)
-        return report.error(ErrorCode::notFound, &record.error(),
-                            "No Container with userId: %u, identifier: %s, Class: %ld", request.userId,
-                            ZOR_SHOWN(request.identifier), static_cast<long>(request.containerClass));
+        return Reporter(needs_.log, function)
+            .error(ErrorCode::notFound, &record.error(), "No Container with userId: %u, identifier: %s, Class: %ld",
+                   request.userId, ZOR_SHOWN(request.identifier), static_cast<long>(request.containerClass));
     const ZORMetadata& found = **record;
     return std::make_shared<const ZORMetadata>(found.uid(), found.uuid(), found.containerClass(), found.identifier(),
                                                found.info(), found.place());

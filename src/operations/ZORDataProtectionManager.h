@@ -100,6 +100,7 @@ private:
     Result<std::shared_ptr<ZORDataProtectionChangeOperation>> prepare(const Request& request,
                                                                       const Completion& completion);
     Result<std::shared_ptr<const ZORMetadata>> containerOf(const Request& request);
+    Result<std::shared_ptr<const ZORMetadata>> copyOfRecord(const Request& request);
     Result<void> checkClass(const Request& request);
     /// Error 61 when too many wait already.
     Result<void> checkBound(const Request& request) ZOR_EXCLUDES(mutex_);

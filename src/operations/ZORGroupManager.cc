@@ -59,14 +59,14 @@ void ZORGroupManager::prepare(const std::string& identifier) {
 }
 
 Result<void> ZORGroupManager::refuseIfUnderWay(const std::string& identifier, const AllIdentifiersWriteLock& /*held*/) {
-    if (needs_.recovery.underWay().noneUnderWay())
+    if (needs_.replaces.noneUnderWay())
         return {}; // the groups need not be put together
     const UserNumbers& users = needs_.configuration.users();
     const auto refuse = [&](GroupType type, const Identifiers& groups, std::uint32_t first,
                             std::uint32_t last) -> Result<void> {
         for (const std::string& group : groups.value_or(std::vector<std::string>()))
             for (std::uint32_t userId = first; userId <= last; ++userId)
-                TRY(needs_.recovery.refuseIfUnderWay(userId, classOf(type), group));
+                TRY(needs_.replaces.refuseIfUnderWay(userId, classOf(type), group));
         return {};
     };
     TRY(refuse(GroupType::application, needs_.entitlements.appGroupIdentifiersForIdentifier(identifier), users.first,
@@ -123,7 +123,7 @@ Result<void> ZORGroupManager::_removeGroupContainersIfNeededforUser(
         return {};
     }
     // Between its moves a replace has no live container.
-    TRY(needs_.recovery.refuseIfUnderWay(userId, containerClass, group));
+    TRY(needs_.replaces.refuseIfUnderWay(userId, containerClass, group));
     const auto record = needs_.cache.containerForUser(userId, containerClass, &group, false);
     if (!record) {
         ZOR_LOG(needs_.log, logLevelDebug,
@@ -208,7 +208,7 @@ Result<std::vector<FoundContainer>> ZORGroupManager::groupContainers(std::uint32
             auto found = needs_.creation.createOrLookupContainerForUser(
                 caller, userId, &group, classOf(type), {.createIfNecessary = true},
                 ahead.try_emplace(group, needs_.maker).first->second, lock);
-            if (!found && ReplaceRecovery::metOneUnderWay(found.error()))
+            if (!found && WaitingReplaces::metOneUnderWay(found.error()))
                 return std::move(found).error();
             if (!found)
                 isUnavailable(group, found.error());
@@ -220,7 +220,7 @@ Result<std::vector<FoundContainer>> ZORGroupManager::groupContainers(std::uint32
         return {};
     };
     for (;;) {
-        TRY(needs_.recovery.undisturbed(look));
+        TRY(needs_.replaces.undisturbed(look));
         if (missing.empty())
             return containers;
         for (const std::string& group : missing)

@@ -62,7 +62,7 @@ public:
     [[nodiscard]] Result<void> refuseIfUnderWay(const std::string& identifier, const AllIdentifiersWriteLock& lock);
     /// Stages the containers of groups that lose their last reference by a change of `identifier` that has not been
     /// applied: the map still holds what was before. `changed` as ContainerRemoval::stage has it. One that cannot be
-    /// staged is logged and stays for the next boot; an error only where ReplaceRecovery::metOneUnderWay.
+    /// staged is logged and stays for the next boot; an error only where WaitingReplaces::metOneUnderWay.
     Result<void> handleChangeFromOldGroupContainerIds(Identifiers oldGroups, const Identifiers& newGroups,
                                                       GroupType type, const std::string& identifier,
                                                       std::vector<FileURL>& changed,

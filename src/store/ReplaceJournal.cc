@@ -121,7 +121,13 @@ using platform::MutexLock;
 
 void WaitingReplaces::add(Waiting waiting) {
     const MutexLock held(mutex_);
-    std::erase_if(waiting_, [&](const Waiting& one) { return one.journalUrl == waiting.journalUrl; });
+    const auto known = std::ranges::find(waiting_, waiting.journalUrl, &Waiting::journalUrl);
+    if (known != waiting_.end()) {
+        // The places of a journal that was read once are not forgotten for a look that tells less.
+        if (known->oldUrl.empty())
+            *known = std::move(waiting);
+        return;
+    }
     waiting_.reserve(waiting_.size() + underWay_.size() + 1);
     waiting_.push_back(std::move(waiting));
     update();
@@ -171,14 +177,28 @@ void WaitingReplaces::end(const FileURL& journalUrl, Ended how) noexcept {
 }
 
 bool WaitingReplaces::isUnderWay(std::uint32_t userId, ContainerClass containerClass,
-                                 std::string_view identifier) const {
+                                 const std::string_view* identifier) const {
     if (noneUnderWay())
         return false;
     const MutexLock held(mutex_);
     return std::ranges::any_of(underWay_, [&](const UnderWay& one) {
         return one.containers.userId == userId && one.containers.containerClass == containerClass &&
-               std::ranges::find(one.containers.identifiers, identifier) != one.containers.identifiers.end();
+               (!identifier ||
+                std::ranges::find(one.containers.identifiers, *identifier) != one.containers.identifiers.end());
     });
+}
+
+Result<void> WaitingReplaces::refuseIfUnderWay(std::uint32_t userId, ContainerClass containerClass,
+                                               std::string_view identifier) const {
+    if (!isUnderWay(userId, containerClass, &identifier))
+        return {};
+    return posixError(ZOR_HERE, Errno(EINPROGRESS), "a replace of %s is under way", ZOR_SHOWN(std::string(identifier)));
+}
+
+Result<void> WaitingReplaces::refuseIfUnderWay(std::uint32_t userId, ContainerClass containerClass) const {
+    if (!isUnderWay(userId, containerClass, nullptr))
+        return {};
+    return posixError(ZOR_HERE, Errno(EINPROGRESS), "a replace in class %s is under way", className(containerClass));
 }
 
 std::uint64_t WaitingReplaces::ended() const {

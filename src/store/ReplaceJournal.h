@@ -14,6 +14,7 @@
 
 #include <array>
 #include <atomic>
+#include <cerrno>
 #include <cstdint>
 #include <string>
 #include <string_view>
@@ -92,8 +93,27 @@ public:
     /// One that has not come to its end waits from now on. Needs no memory; no journal of that name: nothing happens.
     enum class Ended { settled, waits };
     void end(const FileURL& journalUrl, Ended how) noexcept;
+    /// Whether a replace of this identifier is under way; nullptr: of any of the class.
     [[nodiscard]] bool isUnderWay(std::uint32_t userId, ContainerClass containerClass,
-                                  std::string_view identifier) const;
+                                  const std::string_view* identifier) const;
+    /// An error while one is: whoever holds a lock lets go of it, and comes again when that one has ended.
+    [[nodiscard]] Result<void> refuseIfUnderWay(std::uint32_t userId, ContainerClass containerClass,
+                                                std::string_view identifier) const;
+    [[nodiscard]] Result<void> refuseIfUnderWay(std::uint32_t userId, ContainerClass containerClass) const;
+    /// Whether an error says that: nothing has been done.
+    [[nodiscard]] static bool metOneUnderWay(const ZORError& error) { return error.isPosix(EINPROGRESS); }
+    /// Runs `step`, which takes the lock, until it meets no replace that is under way and has to do with its container:
+    /// before it comes again, that one has ended. Without a lock.
+    template <typename Step>
+    auto undisturbed(Step&& step) const -> decltype(step()) {
+        for (;;) {
+            const std::uint64_t before = ended();
+            auto result = step();
+            if (result || !metOneUnderWay(result.error()))
+                return result;
+            awaitMoreThan(before);
+        }
+    }
     [[nodiscard]] bool noneUnderWay() const { return noneUnderWay_.load(std::memory_order_acquire); }
     /// How many have ended. A caller that met one under way after it had asked waits until there are more.
     [[nodiscard]] std::uint64_t ended() const;

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // Items that the daemon could not look at, for want of descriptors or because the disk refused: it deletes nothing for
 // that, and keeps no answer that came of it.
+#include "fs/Names.h"
 #include "support/FewDescriptors.h"
 #include "world/World.h"
 
@@ -17,11 +18,17 @@ protected:
     Shortage() { world.load(); }
 
     /// The daemon ended after the first of a replace's two moves.
-    void stopAReplaceOf(const FoundContainer& old) {
+    /// The old one waits in staging or, as one of another file system, aside.
+    void stopAReplaceOf(const FoundContainer& old, bool aside = false) {
         const std::string name = UUID::random().string();
-        world.makeDirectories(staging);
-        world.putJournal(name, {old.path, old.path, staging + "/" + name, old.path});
-        world.move(old.path, staging + "/" + name);
+        const std::string outer = fs::deathRowOuter;
+        const std::string place = aside ? outer + "/" + fs::asideInner : staging;
+        if (aside)
+            world.makeDirectories(outer, ::geteuid(), 0700);
+        world.makeDirectories(place, ::geteuid(), 0700);
+        const std::string waiting = place + "/" + name;
+        world.putJournal(name, {old.path, old.path, staging + "/" + name, old.path, aside ? waiting : ""});
+        world.move(old.path, waiting);
     }
 
     World world;
@@ -35,14 +42,16 @@ TEST_F(Shortage, JournalsThatCannotBeReadKeepWhatTheyName) {
     const std::string there = world.path(journals);
     constexpr int noMemory = -1; // thrown
     constexpr int noDirectory = 0;
-    for (const int trouble : {noDirectory, EIO, ENOMEM, noMemory}) {
-        SCOPED_TRACE(trouble);
-        stopAReplaceOf(old);
+    for (const auto& [trouble, aside] :
+         {std::pair(noDirectory, false), std::pair(EIO, false), std::pair(ENOMEM, false), std::pair(noMemory, false),
+          std::pair(noDirectory, true), std::pair(EIO, true)}) {
+        SCOPED_TRACE(std::to_string(trouble) + (aside ? " aside" : ""));
+        stopAReplaceOf(old, aside);
         if (trouble == noDirectory) {
             world.move(there, there + ".aside");
             world.write(journals, "no directory");
         }
-        world.disk().unreadable = [&](int fd) {
+        world.disk().unreadable = [&, trouble = trouble](int fd) {
             const auto path = std::filesystem::read_symlink("/proc/self/fd/" + std::to_string(fd)).string();
             const bool fails = trouble != noDirectory && path.starts_with(there);
             return fails && trouble == noMemory ? throw std::bad_alloc() : fails ? trouble : 0;
