@@ -16,6 +16,15 @@ namespace zor {
 
 using platform::FileDescriptor;
 
+namespace {
+
+bool isRemoved(int directory) {
+    struct stat status{};
+    return ::fstat(directory, &status) == 0 && status.st_nlink == 0;
+}
+
+} // namespace
+
 Result<void> Replace::openDirectories(Progress& progress) {
     // Their owner may have put something else, or another's directory, in their places. Old and new one are of
     // one class and user.
@@ -73,6 +82,15 @@ Result<void> Replace::moveOldAway(const ReplaceRequest& request, Progress& progr
     progress.moved = &directories.old;
     const auto moved =
         needs_.fileManager.renameItem(directories.old.get(), progress.oldUrl, waiting, progress.waitingUrl);
+    if (!moved && isRemoved(waiting)) {
+        // A pass over the death row took the empty place away meanwhile. It is made anew.
+        endUnderWay(progress, WaitingReplaces::Ended::settled);
+        progress.waitingUrl = FileURL();
+        progress.moved = nullptr;
+        restoreUuid(progress);
+        progress.stale = true;
+        return {};
+    }
     if (!moved)
         return oldNotMoved(progress, moved.error());
     // There nobody else can put another in its place.

@@ -88,6 +88,8 @@ public:
     }
 
     std::map<std::string, Session> sessions;
+    /// Has no answer to questions about a session.
+    static inline bool isBusy = false;
     /// The connection that asked last.
     std::string asker;
 
@@ -115,7 +117,9 @@ private:
         return session == sessions.end() ? 0 : 1;
     }
     static int get(sd_bus*, const char*, const char*, const char* property, sd_bus_message* reply, void* found,
-                   sd_bus_error*) {
+                   sd_bus_error* error) {
+        if (isBusy)
+            return sd_bus_error_set(error, SD_BUS_ERROR_LIMITS_EXCEEDED, "busy");
         const auto& session = *static_cast<Session*>(found);
         if (std::string_view(property) == "Class")
             return sd_bus_message_append(reply, "s", session.kind);
@@ -196,14 +200,20 @@ TEST(Lockd, TellsWhatTheLoginServiceSays) {
         {"the open one ends, and the other is still locked", [&] { login.end("d"); }, "1\n"},
         {"a user switch: another logs in", [&] { login.begin("e", {.kind = "user-light"}); }, "0\n"},
         {"and out again, leaving a process", [&] { login.close("e"); }, "1\n"},
-        {"the service goes, which unlocks nothing, also where others say so; it comes back, having forgotten a signal",
+        {"the service goes, which unlocks nothing, also where others say so; it comes back without an answer, then "
+         "having forgotten a signal",
          [&] {
              login.leave();
              hostile.signal("a", "Unlock", login.asker);
              EXPECT_TRUE(staysLocked());
              login.sessions.at(LoginService::path("a")).hint = false;
-             login.own();
-             EXPECT_TRUE(staysLocked());
+             for (const bool busy : {true, false}) {
+                 login.isBusy = busy;
+                 login.own();
+                 EXPECT_TRUE(staysLocked());
+                 if (busy)
+                     login.leave();
+             }
              login.signal("a", "Unlock");
          },
          "0\n"},

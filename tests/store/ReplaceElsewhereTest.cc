@@ -18,12 +18,14 @@ using Preserve = ZORClientConnection::PreserveOldUUID;
 
 // Goal: with the home on another file system nothing is copied to get out of the way, whatever its owner does
 // meanwhile; where two names cannot be exchanged the replace succeeds all the same. Method: an old one with what no
-// copy can make; an exchange, and the move after it, that are refused; an owner who swaps before the exchange.
+// copy can make; an exchange, and the move after it, that are refused; a pass over the death row before the journal; an
+// owner who swaps before the exchange.
 TEST(ReplaceAtHome, ChangesPlaces) {
-    enum class Row { plain, cannotExchange, cannotRename, swapped };
+    enum class Row { plain, cannotExchange, passMeanwhile, cannotRename, swapped };
     if (!MountedHome::canBe())
         GTEST_SKIP() << "skipped: only root may mount a home";
-    for (const Row row : {Row::plain, Row::cannotExchange, Row::cannotRename, Row::swapped})
+    const std::string aside = std::string("private/var/mobile/") + fs::deathRowOuter + "/" + fs::asideInner;
+    for (const Row row : {Row::plain, Row::cannotExchange, Row::passMeanwhile, Row::cannotRename, Row::swapped})
         for (const Preserve preserve : {Preserve::no, Preserve::yes}) {
             SCOPED_TRACE(std::to_string(static_cast<int>(row)) + (preserve == Preserve::yes ? " preserving" : ""));
             World world;
@@ -37,7 +39,8 @@ TEST(ReplaceAtHome, ChangesPlaces) {
             };
             world.write(world.relative(old.path) + "/content", "old");
             world.write(world.relative(fresh.path) + "/content", "new");
-            ASSERT_TRUE(row == Row::cannotExchange || ::mknod((old.path + "/whiteout").c_str(), S_IFCHR, 0) == 0);
+            ASSERT_TRUE(row == Row::cannotExchange || row == Row::passMeanwhile ||
+                        ::mknod((old.path + "/whiteout").c_str(), S_IFCHR, 0) == 0);
             int moves = 0;
             world.disk().arm({.error = EINVAL, .span = FaultSpan::fromThenOn, .filter = [&](const DiskCallInfo& call) {
                                   if (call.subject != nameOf(old.path) + " -> " + nameOf(fresh.path))
@@ -46,11 +49,21 @@ TEST(ReplaceAtHome, ChangesPlaces) {
                                   EXPECT_TRUE(row != Row::swapped || moves != 1 ||
                                               ::renameat2(AT_FDCWD, old.path.c_str(), AT_FDCWD, decoy.path.c_str(),
                                                           RENAME_EXCHANGE) == 0);
-                                  return (row == Row::cannotExchange && moves == 1) ||
+                                  return ((row == Row::cannotExchange || row == Row::passMeanwhile) && moves == 1) ||
                                          (row == Row::cannotRename && moves == 2);
                               }});
+            bool hasPassed = row != Row::passMeanwhile;
+            world.disk().before = [&](const DiskCallInfo& call) {
+                if (call.call != DiskCall::createFile || !world.exists(aside) || std::exchange(hasPassed, true))
+                    return;
+                EXPECT_EQ(world.stage(decoy), ErrorCode::success);
+                EXPECT_EQ(world.pass(), ErrorCode::success);
+                EXPECT_FALSE(world.exists(aside));
+            };
             const auto replaced = world.replace(&old, fresh, preserve);
+            world.disk().before = nullptr;
             world.disk().disarm();
+            EXPECT_TRUE(hasPassed);
             EXPECT_EQ(codeOf(replaced), row == Row::swapped ? ErrorCode::oldNotMovedToStaging : ErrorCode::success);
             if (row == Row::swapped) {
                 EXPECT_EQ(contentAt(fresh.path), "new");

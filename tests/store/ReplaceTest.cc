@@ -367,6 +367,7 @@ TEST_F(ReplaceWithoutOrder, ASyncThatFailsLosesNothing) {
 // between the two moves is held up; requests meanwhile.
 TEST_F(ReplaceWithoutOrder, OnlyWhoHasToDoWithItWaits) {
     constexpr ContainerClass group = ContainerClass::sharedAppGroup;
+    const std::string key = "k";
     world.write(groupMarkerPath, ""); // without it nothing goes for want of a reference
     using Requests = std::vector<std::function<ErrorCode(const FoundContainer& fresh, const FoundContainer& holder)>>;
     const Requests rounds[] = {
@@ -377,6 +378,19 @@ TEST_F(ReplaceWithoutOrder, OnlyWhoHasToDoWithItWaits) {
          }},
         {[&](auto&, auto&) { return world.entitle("holder", std::nullopt); }},
         {[&](auto&, auto& holder) { return world.stage(holder); }}, // holder's child has the group
+        {[&](auto& fresh, auto&) {
+             const plist::Value value(true);
+             return codeOf(world.daemonsClient().setInfoValue(&value, &key, addressOf(fresh), UseLocking::yes));
+         },
+         [&](auto& fresh, auto&) { return codeOf(world.daemonsClient().metadataForUser(addressOf(fresh))); },
+         [&](auto& fresh, auto&) {
+             return codeOf(world.daemonsClient().recreateDefaultStructureForUser(addressOf(fresh)));
+         },
+         [&](auto& fresh, auto&) { return world.daemonsClient().diskUsageForUserId(addressOf(fresh)).error; },
+         [&](auto&, auto&) {
+             const auto listed = world.daemonsClient().containersForUser(mobile, group, false);
+             return listed && listed->size() == 1 ? ErrorCode::success : ErrorCode::notFound;
+         }},
     };
     for (const Requests& round : rounds) {
         SCOPED_TRACE(&round - rounds);

@@ -7,6 +7,7 @@
 #include <optional>
 #include <string_view>
 #include <utility>
+#include <vector>
 
 namespace zorvanelockd {
 
@@ -24,41 +25,54 @@ struct Unref {
 };
 using Message = std::unique_ptr<sd_bus_message, Unref>;
 
-/// A property of a session; nullptr where it cannot be had, as of one that has just ended.
-Message property(sd_bus* bus, const std::string& path, const char* name, const char* type) {
-    sd_bus_message* reply = nullptr;
-    (void)sd_bus_get_property(bus, service, path.c_str(), sessionInterface, name, nullptr, &reply, type);
-    return Message(reply);
-}
+/// Asks one session. A session that has ended has no properties; where a property cannot be had for another reason, the
+/// answers say nothing.
+class Question {
+public:
+    Question(sd_bus* bus, const std::string& path) : bus_(bus), path_(path) {}
 
-std::string textOf(sd_bus* bus, const std::string& path, const char* name) {
-    const Message reply = property(bus, path, name, "s");
-    const char* text = nullptr;
-    return reply && sd_bus_message_read(reply.get(), "s", &text) > 0 ? text : "";
-}
+    /// A person's; newer services tell those apart that need less of the system, or begin before it is up.
+    bool isUsers() {
+        constexpr std::string_view kinds[] = {"user", "user-early", "user-light", "user-early-light"};
+        return std::ranges::find(kinds, text("Class")) != std::end(kinds);
+    }
+    bool isClosing() { return text("State") == "closing"; }
+    bool hasSeat() {
+        const Message reply = property("Seat", "(so)");
+        const char* seat = nullptr;
+        const char* seatPath = nullptr;
+        return reply && sd_bus_message_read(reply.get(), "(so)", &seat, &seatPath) > 0 && *seat != '\0';
+    }
+    std::optional<bool> lockedHint() {
+        const Message reply = property("LockedHint", "b");
+        int hint = 0;
+        return reply && sd_bus_message_read(reply.get(), "b", &hint) > 0 ? std::optional(hint != 0) : std::nullopt;
+    }
+    [[nodiscard]] bool isAnswered() const { return isAnswered_; }
 
-/// A person's; newer services tell those apart that need less of the system, or begin before it is up.
-bool isUsers(sd_bus* bus, const std::string& path) {
-    constexpr std::string_view kinds[] = {"user", "user-early", "user-light", "user-early-light"};
-    return std::ranges::find(kinds, textOf(bus, path, "Class")) != std::end(kinds);
-}
+private:
+    Message property(const char* name, const char* type) {
+        if (!isAnswered_)
+            return nullptr; // a service that is slow is not waited for four times
+        sd_bus_error error = SD_BUS_ERROR_NULL;
+        sd_bus_message* reply = nullptr;
+        const int failure =
+            sd_bus_get_property(bus_, service, path_.c_str(), sessionInterface, name, &error, &reply, type);
+        isAnswered_ = failure >= 0 || sd_bus_error_has_name(&error, SD_BUS_ERROR_UNKNOWN_OBJECT) != 0 ||
+                      sd_bus_error_has_name(&error, "org.freedesktop.login1.NoSuchSession") != 0;
+        sd_bus_error_free(&error);
+        return Message(reply);
+    }
+    std::string text(const char* name) {
+        const Message reply = property(name, "s");
+        const char* text = nullptr;
+        return reply && sd_bus_message_read(reply.get(), "s", &text) > 0 ? text : "";
+    }
 
-bool isClosing(sd_bus* bus, const std::string& path) {
-    return textOf(bus, path, "State") == "closing";
-}
-
-bool hasSeat(sd_bus* bus, const std::string& path) {
-    const Message reply = property(bus, path, "Seat", "(so)");
-    const char* seat = nullptr;
-    const char* seatPath = nullptr;
-    return reply && sd_bus_message_read(reply.get(), "(so)", &seat, &seatPath) > 0 && *seat != '\0';
-}
-
-std::optional<bool> lockedHint(sd_bus* bus, const std::string& path) {
-    const Message reply = property(bus, path, "LockedHint", "b");
-    int hint = 0;
-    return reply && sd_bus_message_read(reply.get(), "b", &hint) > 0 ? std::optional(hint != 0) : std::nullopt;
-}
+    sd_bus* const bus_;
+    const std::string& path_;
+    bool isAnswered_ = true;
+};
 
 } // namespace
 
@@ -111,9 +125,11 @@ void Sessions::begin() {
             add(path);
             const auto now = sessions_.find(path);
             const auto then = before.find(path);
-            if (now != sessions_.end() && now->second == Lock::open && then != before.end() &&
-                then->second == Lock::bySignal)
-                now->second = Lock::bySignal;
+            if (now == sessions_.end() || then == before.end())
+                continue;
+            // The service does not remember a signal, and this one remembers what cannot be asked.
+            if ((now->second == Lock::open && then->second == Lock::bySignal) || now->second == Lock::unknown)
+                now->second = then->second;
         }
         tell();
     }
@@ -121,18 +137,34 @@ void Sessions::begin() {
 }
 
 void Sessions::add(const std::string& path) {
-    if (!isUsers(bus_, path) || !hasSeat(bus_, path) || isClosing(bus_, path))
-        return;
-    if (const auto hint = lockedHint(bus_, path))
+    Question question(bus_, path);
+    const bool counts = question.isUsers() && question.hasSeat() && !question.isClosing();
+    const auto hint = counts ? question.lockedHint() : std::nullopt;
+    if (!question.isAnswered())
+        sessions_.try_emplace(path, Lock::unknown);
+    else if (hint)
         sessions_[path] = *hint ? Lock::byHint : Lock::open;
+    else
+        sessions_.erase(path);
+}
+
+void Sessions::askUnknownAgain() {
+    std::vector<std::string> paths;
+    for (const auto& [path, lock] : sessions_)
+        if (lock == Lock::unknown)
+            paths.push_back(path);
+    for (const std::string& path : paths)
+        add(path);
 }
 
 void Sessions::forgetClosing() {
-    std::erase_if(sessions_,
-                  [&](const auto& session) { return session.second == Lock::open && isClosing(bus_, session.first); });
+    std::erase_if(sessions_, [&](const auto& session) {
+        return session.second == Lock::open && Question(bus_, session.first).isClosing();
+    });
 }
 
 void Sessions::tell() {
+    askUnknownAgain();
     forgetClosing();
     changed_(!sessions_.empty() &&
              std::ranges::all_of(sessions_, [](const auto& session) { return session.second != Lock::open; }));

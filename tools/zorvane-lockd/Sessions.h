@@ -38,7 +38,9 @@ private:
 
     /// Asks the service for all that there is. One that does not answer leaves everything as it was.
     void begin();
+    /// One that cannot be asked stays as it is known.
     void add(const std::string& path);
+    void askUnknownAgain();
     /// Leaves out the open sessions that are closing: the service does not say when they begin to.
     void forgetClosing();
     void tell();
@@ -48,7 +50,8 @@ private:
     const Changed changed_;
     /// The connection that owns the service's name; empty while nobody does.
     std::string owner_;
-    enum class Lock : std::uint8_t { open, bySignal, byHint };
+    /// One that could not be asked holds nothing open: it may be locked.
+    enum class Lock : std::uint8_t { open, bySignal, byHint, unknown };
     /// By the sessions' object paths.
     std::map<std::string, Lock> sessions_;
 };
