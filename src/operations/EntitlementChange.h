@@ -66,7 +66,8 @@ private:
     /// Does the same as prepareRemoval, for a change of one identifier.
     void prepare(const std::string& identifier);
     std::vector<std::string> withChildren(const std::string& identifier) const;
-    /// Error metOneUnderWay while something that goes with the entitlements of `identifier` is being replaced.
+    /// Error WaitingReplaces::metOneUnderWay while something that goes with the entitlements of `identifier` is being
+    /// replaced.
     [[nodiscard]] Result<void> refuseIfUnderWay(const std::string& identifier, const AllIdentifiersWriteLock& lock);
     void sayIfNotCleared(const std::string& identifier, ErrorCode code) const;
     /// `change` gets what is to be settled, if anything is. An error of WaitingReplaces::metOneUnderWay comes before

@@ -91,7 +91,8 @@ private:
 
     // Replace.cc
     Result<void> checkReplace(const ReplaceRequest& request);
-    /// One round: prepared, moved, on the disk. metOneUnderWay; or `progress.stale`: nothing has happened.
+    /// One round: prepared, moved, on the disk. WaitingReplaces::metOneUnderWay; or `progress.stale`: nothing has
+    /// happened.
     Result<void> replaceOnce(const ReplaceRequest& request, Progress& progress, bool mayExchange,
                              StartDeletionThread startDeletionThread);
     Result<void> move(const ReplaceRequest& request, Progress& progress, StartDeletionThread startDeletionThread);

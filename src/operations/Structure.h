@@ -41,7 +41,7 @@ public:
     Result<void> regenerateDirectoryUUIDForUser(const ContainerAddress& address);
 
 private:
-    /// With metOneUnderWay.
+    /// With WaitingReplaces::metOneUnderWay.
     Result<void> regenerate(const ContainerAddress& address);
     /// The standard subdirectories of the container that `changed` begins with; each is added to it. New ones get the
     /// protection class.

@@ -57,8 +57,8 @@ public:
 
     /// Reads what the next two operations need. Called without a lock, before entitlements of `identifier` change.
     void prepare(const std::string& identifier);
-    /// Error metOneUnderWay while the container of a group of `identifier` is being replaced, whoever else refers to
-    /// it.
+    /// Error WaitingReplaces::metOneUnderWay while the container of a group of `identifier` is being replaced, whoever
+    /// else refers to it.
     [[nodiscard]] Result<void> refuseIfUnderWay(const std::string& identifier, const AllIdentifiersWriteLock& lock);
     /// Stages the containers of groups that lose their last reference by a change of `identifier` that has not been
     /// applied: the map still holds what was before. `changed` as ContainerRemoval::stage has it. One that cannot be
