@@ -20,7 +20,7 @@ Result<void> Structure::recreateDefaultStructureForUser(const ContainerAddress& 
         constexpr const char* function = "recreateDefaultStructureForUser";
         TRY(checkAddress(needs_.log, function, address));
         std::vector<FileURL> changed;
-        const auto structure = needs_.replaces.undisturbed([&]() -> Result<void> {
+        auto structure = needs_.replaces.undisturbed([&]() -> Result<void> {
             const IdentifierWriteLock lock(needs_.locks, address.lockName(), Touches::nothing());
             const auto record = TRY(knownContainer(needs_, function, address, lock));
             changed = {record->url()};

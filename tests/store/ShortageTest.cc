@@ -42,16 +42,18 @@ TEST_F(Shortage, JournalsThatCannotBeReadKeepWhatTheyName) {
     const std::string there = world.path(journals);
     constexpr int noMemory = -1; // thrown
     constexpr int noDirectory = 0;
-    for (const auto& [trouble, aside] :
-         {std::pair(noDirectory, false), std::pair(EIO, false), std::pair(ENOMEM, false), std::pair(noMemory, false),
-          std::pair(noDirectory, true), std::pair(EIO, true)}) {
+    const std::pair<int, bool> rows[] = {{noDirectory, false}, {EIO, false},        {ENOMEM, false},
+                                         {noMemory, false},    {noDirectory, true}, {EIO, true}};
+    for (const auto& row : rows) {
+        const int trouble = row.first;
+        const bool aside = row.second;
         SCOPED_TRACE(std::to_string(trouble) + (aside ? " aside" : ""));
         stopAReplaceOf(old, aside);
         if (trouble == noDirectory) {
             world.move(there, there + ".aside");
             world.write(journals, "no directory");
         }
-        world.disk().unreadable = [&, trouble = trouble](int fd) {
+        world.disk().unreadable = [&](int fd) {
             const auto path = std::filesystem::read_symlink("/proc/self/fd/" + std::to_string(fd)).string();
             const bool fails = trouble != noDirectory && path.starts_with(there);
             return fails && trouble == noMemory ? throw std::bad_alloc() : fails ? trouble : 0;
