@@ -61,6 +61,7 @@ TEST(ReplaceAtHome, ChangesPlaces) {
                 EXPECT_FALSE(world.exists(aside));
             };
             const auto replaced = world.replace(&old, fresh, preserve);
+            world.drainDeathRow();
             world.disk().before = nullptr;
             world.disk().disarm();
             EXPECT_TRUE(hasPassed);
