@@ -71,6 +71,8 @@ platform::Syncs syncsFromEnvironment() {
 
 /// How long the threads that serve clients may take to end. A kill is safe at any moment, so nothing is lost by it.
 constexpr unsigned stopSecondsMax = 10;
+/// The same for work that is under way: below the minute and a half after which systemd kills.
+constexpr unsigned workSecondsMax = 60;
 
 /// Ends the run loop on SIGTERM or SIGINT, as soon as nothing is under way.
 class StopOnSignal {
@@ -93,12 +95,14 @@ public:
 
 private:
     void stopIfWanted() {
-        if (!wanted_ || transactions_.count() != 0)
+        if (!wanted_)
             return;
-        // A request that waits for a file system that has died would keep the process for ever.
+        // Work or a request that waits for a file system that has died would keep the process for ever.
+        const bool isIdle = transactions_.count() == 0;
         std::signal(SIGALRM, [](int) { ::_exit(0); });
-        ::alarm(stopSecondsMax);
-        loop_.stop();
+        ::alarm(isIdle ? stopSecondsMax : workSecondsMax);
+        if (isIdle)
+            loop_.stop();
     }
 
     platform::SignalDescriptor signals_{SIGTERM, SIGINT};

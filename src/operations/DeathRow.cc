@@ -3,6 +3,7 @@
 
 #include "fs/Durability.h"
 #include "fs/FileSystemDeathRow.h"
+#include "fs/MountFences.h"
 #include "fs/Names.h"
 #include "os/FileDescriptor.h"
 #include "os/FileModes.h"
@@ -375,6 +376,9 @@ void DeathRow::deleteEverythingHidden(Pass& pass) {
 
 void DeathRow::deleteEverythingOnDeathRowOf(const FileURL& place, Pass& pass) {
     ZORFileManager& fileManager = needs_.fileManager;
+    // A home that answered a moment ago may have died; nobody waits for this thread, but it would do no more.
+    if (!fileManager.resolver().answers(place, fs::MountFence::Asked::now))
+        return;
     const auto top = fs::topOfMount(fileManager.resolver(), place);
     if (!top || !pass.seen.insert(top->identity).second)
         return;

@@ -143,6 +143,7 @@ TEST(UserMount, AHomeThatFallsSilent) {
         return isAnswered(daemon, [](auto& client) { return come(client.createOrLookup(dataContainer("new"))); });
     };
     EXPECT_LT(secondsOf([&] { EXPECT_TRUE(asks()); }), 1);
+    EXPECT_TRUE(isAnswered(daemon, [](auto& one) { return come(one.emptyDeathRow()); })); // no pass is in its midst
     home.fallSilent();
     std::jthread asking([&] { EXPECT_TRUE(asks()); });
     auto client = daemon.client();
