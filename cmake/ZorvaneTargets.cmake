@@ -123,8 +123,8 @@ function(zor_program name)
         $<$<BOOL:${ZORVANE_STATIC_RUNTIME}>:-static-libstdc++;-static-libgcc>)
 endfunction()
 
-# zor_test(area [DIR dirs...] [COST seconds] [WAITING filter] LINK libs...): every tests/<area>/*.cc, or those of the folders, in one GoogleTest
-# program named zor_<area>_tests. Tests that cost more begin earlier.
+# zor_test(area [DIR dirs...] [COST seconds] [WAITING filter] LINK libs...): every tests/<area>/*.cc, or those of the folders,
+# in one GoogleTest program named zor_<area>_tests. Tests that cost more begin earlier, and those that mostly wait before them.
 function(zor_test area)
     cmake_parse_arguments(ARG "" "COST;WAITING" "DIR;LINK" ${ARGN})
     if(NOT ARG_COST)

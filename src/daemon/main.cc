@@ -71,7 +71,7 @@ platform::Syncs syncsFromEnvironment() {
 
 /// How long the threads that serve clients may take to end. A kill is safe at any moment, so nothing is lost by it.
 constexpr unsigned stopSecondsMax = 10;
-/// The same for work that is under way: below the minute and a half after which systemd kills.
+/// The same for work that is under way, where no service manager kills sooner, as systemd does with the unit.
 constexpr unsigned workSecondsMax = 60;
 
 /// Ends the run loop on SIGTERM or SIGINT, as soon as nothing is under way.

@@ -376,7 +376,8 @@ void DeathRow::deleteEverythingHidden(Pass& pass) {
 
 void DeathRow::deleteEverythingOnDeathRowOf(const FileURL& place, Pass& pass) {
     ZORFileManager& fileManager = needs_.fileManager;
-    // A home that answered a moment ago may have died; nobody waits for this thread, but it would do no more.
+    // A home that answered a moment ago may have died. In it this thread would wait for ever, and a stop for the
+    // thread.
     if (!fileManager.resolver().answers(place, fs::MountFence::Asked::now))
         return;
     const auto top = fs::topOfMount(fileManager.resolver(), place);
