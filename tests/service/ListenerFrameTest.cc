@@ -92,7 +92,7 @@ TEST(ListenerFrame, DeferredRepliesComeInAnyOrderOnce) {
     ListenerWorld world;
     KeptReplies replies;
     world.start([&](PeerConnection&, ServiceEvent& event) {
-        if (event.request == question)
+        if (event.request == ordinaryRequest)
             event.reply->send(event.request);
         else
             replies.keep(event);

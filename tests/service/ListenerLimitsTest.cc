@@ -93,7 +93,7 @@ TEST(ListenerLimits, APeerThatNeverReadsIsNotReadFrom) {
     const plist::Dictionary large = {{"Payload", plist::Data(300'000, 7)}};
     std::atomic<int> largeServed{0};
     world.start([&](PeerConnection&, ServiceEvent& event) {
-        const bool isLarge = event.request != question;
+        const bool isLarge = event.request != ordinaryRequest;
         largeServed += isLarge ? 1 : 0;
         event.reply->send(isLarge ? large : event.request);
     });

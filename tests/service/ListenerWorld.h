@@ -112,7 +112,7 @@ inline plist::Dictionary numbered(std::uint64_t number) {
 }
 
 /// The request of a client that wants to know whether it is served.
-inline const plist::Dictionary question = {{"Question", true}};
+inline const plist::Dictionary ordinaryRequest = {{"Question", true}};
 
 /// As many frames as that, numbered from 0 on, which are also their ids.
 inline plist::Data burstOf(std::uint64_t count, std::uint32_t flags = ipc::frameExpectsReply) {
@@ -158,7 +158,7 @@ public:
         return received == 0 || (received < 0 && errno == ECONNRESET);
     }
     /// A request that comes back, so the listener is alive for this client.
-    bool isServed() { return send(question, 4711) && receives(4711, question); }
+    bool isServed() { return send(ordinaryRequest, 4711) && receives(4711, ordinaryRequest); }
     void close() { socket_.reset(); }
 
 private:
