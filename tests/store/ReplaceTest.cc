@@ -2,6 +2,7 @@
 // Replace and wipe: what is swapped, what is refused, what each failing step leaves, and what a launch makes of each
 // state that a stop can leave.
 #include "fs/Names.h"
+#include "operations/ZORDataProtectionManager.h"
 #include "world/World.h"
 
 #include <atomic>
@@ -390,6 +391,13 @@ TEST_F(ReplaceWithoutOrder, OnlyWhoHasToDoWithItWaits) {
          [&](auto&, auto&) {
              const auto listed = world.daemonsClient().containersForUser(mobile, group, false);
              return listed && listed->size() == 1 ? ErrorCode::success : ErrorCode::notFound;
+         },
+         [&](auto&, auto&) { // to the class that it has
+             std::promise<ErrorCode> told;
+             world.services().store().dataProtection.setDataProtectionOnDataContainerForUser(
+                 {.userId = mobile, .identifier = "id", .containerClass = group, .dataProtectionClass = 3},
+                 [&](ErrorCode code) { told.set_value(code); });
+             return told.get_future().get();
          }},
     };
     for (const Requests& round : rounds) {
