@@ -31,10 +31,11 @@ target_compile_options(zor_options INTERFACE -fPIC)
 # The headers of libraries take half of the time that a translation unit takes without this. tools/house.py looks whether
 # sources include those that they use.
 # zor_precompile(name LINK ... HEADERS ...): the standard headers and these, for the targets of this folder from here on.
-option(ZORVANE_PCH "Precompile the headers of libraries" ON)
+# Lint judges the product's sources as they are, and has the headers of tests precompiled: they are most of a test's text.
+set(ZORVANE_PCH all CACHE STRING "Which sources have the headers of libraries precompiled: none, tests, all")
 macro(zor_precompile name)
     cmake_parse_arguments(ARG "" "" "LINK;HEADERS" ${ARGN})
-    if(ZORVANE_PCH)
+    if(ZORVANE_PCH STREQUAL all)
         file(CONFIGURE OUTPUT ${CMAKE_BINARY_DIR}/pch.cc CONTENT "")
         add_library(${name} STATIC ${CMAKE_BINARY_DIR}/pch.cc)
         target_link_libraries(${name} PRIVATE zor_options ${ARG_LINK})
