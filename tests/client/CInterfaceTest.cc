@@ -253,7 +253,7 @@ Async asyncOf(const std::string& root, std::int64_t timeout = patience) {
     return {zorvane_async_new(root.c_str(), timeout, nullptr), zorvane_async_free};
 }
 
-zorvane_request* notes(std::uint32_t flags) {
+zorvane_request* notesRequest(std::uint32_t flags) {
     return zorvane_request_lookup(ZORVANE_DATA_APPLICATION, mobile, app, flags);
 }
 
@@ -271,15 +271,15 @@ TEST(CInterface, AnswersComeThroughTheDescriptor) {
             zorvane_async_dispatch(async.get());
     };
     EXPECT_FALSE(isReadable(async, 0));
-    (void)start(notes(0));
-    (void)start(notes(ZORVANE_CREATE));
-    (void)start(notes(1U << 20U));
+    (void)start(notesRequest(0));
+    (void)start(notesRequest(ZORVANE_CREATE));
+    (void)start(notesRequest(1U << 20U));
     await(3);
     EXPECT_EQ(answers.kinds, "105");
     EXPECT_FALSE(isReadable(async, 0));
 
     // An answer that waits for the dispatch is the last thing that can be cancelled.
-    const std::uint64_t call = start(notes(0));
+    const std::uint64_t call = start(notesRequest(0));
     EXPECT_TRUE(isReadable(async, patience));
     EXPECT_EQ(zorvane_async_cancel(async.get(), call), 1);
     EXPECT_EQ(zorvane_async_cancel(async.get(), call), 0);
@@ -287,10 +287,10 @@ TEST(CInterface, AnswersComeThroughTheDescriptor) {
     EXPECT_FALSE(isReadable(async, 0));
 
     daemon->kill();
-    (void)start(notes(0));
+    (void)start(notesRequest(0));
     await(4);
     daemon->start();
-    (void)start(notes(0));
+    (void)start(notesRequest(0));
     await(5);
     EXPECT_EQ(answers.kinds, "10530");
 }
@@ -304,19 +304,19 @@ TEST(CInterface, SilenceHoldsNobodyUp) {
     });
     zorvane_error error{};
     const Client client(zorvane_connect(silent.root().c_str(), 100, &error), zorvane_client_free);
-    EXPECT_EQ(zorvane_call(client.get(), notes(0), nullptr, &error), ZORVANE_TIMED_OUT);
+    EXPECT_EQ(zorvane_call(client.get(), notesRequest(0), nullptr, &error), ZORVANE_TIMED_OUT);
     EXPECT_NE(std::strstr(error.message, "100 ms"), nullptr) << error.message;
     EXPECT_NE(*error.advice, '\0');
 
     Answers answers;
     Async async = asyncOf(silent.root(), ZORVANE_TIMEOUT_NEVER);
-    const std::uint64_t call = zorvane_async_start(async.get(), notes(0), Answers::take, &answers, nullptr);
-    (void)zorvane_async_start(async.get(), notes(1U << 20U), Answers::take, &answers, nullptr);
+    const std::uint64_t call = zorvane_async_start(async.get(), notesRequest(0), Answers::take, &answers, nullptr);
+    (void)zorvane_async_start(async.get(), notesRequest(1U << 20U), Answers::take, &answers, nullptr);
     EXPECT_FALSE(isReadable(async, 50));
     EXPECT_EQ(zorvane_async_cancel(async.get(), call), 1);
     EXPECT_TRUE(isReadable(async, patience));
     EXPECT_EQ(zorvane_async_dispatch(async.get()), 1U);
-    (void)zorvane_async_start(async.get(), notes(0), Answers::take, &answers, nullptr);
+    (void)zorvane_async_start(async.get(), notesRequest(0), Answers::take, &answers, nullptr);
     EXPECT_FALSE(isReadable(async, 50));
     async.reset();
     EXPECT_EQ(answers.kinds, "5");

@@ -30,8 +30,8 @@ std::string_view textOf(std::span<const std::uint8_t> bytes) {
     return {reinterpret_cast<const char*>(bytes.data()), bytes.size()};
 }
 
-std::unexpected<Failure> refused(std::string_view name, std::string_view reason) {
-    return content::refused(refusal(name, reason));
+std::unexpected<Failure> refusedItem(std::string_view name, std::string_view reason) {
+    return refused(refusal(name, reason));
 }
 
 } // namespace
@@ -62,7 +62,7 @@ Outcome<std::uint32_t> Unpacker::unpack(int records) {
                 return record.flags;
             break;
         case RecordKind::failure:
-            return content::refused("the archive cannot be read: " + zorvane::printable(std::string(textOf(bytes))));
+            return refused("the archive cannot be read: " + zorvane::printable(std::string(textOf(bytes))));
         default:
             return failed("the archive's decoder sends nonsense");
         }
@@ -85,8 +85,7 @@ Outcome<void> Unpacker::fill(int records, std::size_t bytes) {
         if (count < 0)
             return failed("the archive's decoder cannot be read", zor::Errno::last());
         if (count == 0)
-            return content::refused(
-                "the archive's decoder ended too early: the archive asks for too much, or breaks it");
+            return refused("the archive's decoder ended too early: the archive asks for too much, or breaks it");
         end_ += static_cast<std::size_t>(count);
     }
     return {};
@@ -103,20 +102,20 @@ Outcome<std::span<const std::uint8_t>> Unpacker::take(int records, std::size_t b
 Outcome<void> Unpacker::beginEntry(const Record& record, std::string_view name, std::string_view target) {
     auto plain = plainName(name);
     if (!plain)
-        return refused(name, plain.error());
+        return refusedItem(name, plain.error());
     entry_ = {.record = record, .name = std::move(*plain), .target = std::string(target)};
     if (target.find('\0') != target.npos)
-        return refused(name, "its target holds a NUL");
+        return refusedItem(name, "its target holds a NUL");
     const bool hardLink = (record.flags & recordHardLink) != 0;
     if (entry_.name.empty()) {
         // The top is the container itself.
         if (hardLink || !S_ISDIR(record.mode))
-            return refused(name, "the container itself can only be a directory");
+            return refusedItem(name, "the container itself can only be a directory");
         return {};
     }
     const mode_t mode = hardLink ? S_IFREG : static_cast<mode_t>(record.mode);
     if (const auto why = whyRefused({.name = entry_.name, .mode = mode, .linkTarget = target}))
-        return refused(entry_.name, *why);
+        return refusedItem(entry_.name, *why);
     const Place place = TRY(placeOf(entry_.name));
     Outcome<void> made;
     if (hardLink)
@@ -198,7 +197,7 @@ Outcome<void> Unpacker::writeData(const Record& record, std::span<const std::uin
     if (!file_.valid())
         return failed("the archive's decoder sends data of no file");
     if (record.offset < fileEnd_ || record.offset > std::numeric_limits<std::int64_t>::max() - record.first)
-        return refused(entry_.name, "its data is out of order");
+        return refusedItem(entry_.name, "its data is out of order");
     if (record.offset > fileEnd_ && ::lseek(file_.get(), record.offset, SEEK_SET) < 0)
         return cannotMake(zor::Errno::last());
     if (const zor::Errno error = disk_.write(file_.get(), bytes))
@@ -214,7 +213,7 @@ Outcome<void> Unpacker::finishFile() {
     const Record& record = entry_.record;
     const bool hasSize = (record.flags & recordHasSize) != 0;
     if (hasSize && (record.offset < 0 || record.offset < fileEnd_))
-        return refused(entry_.name, "it is longer than it says");
+        return refusedItem(entry_.name, "it is longer than it says");
     if (hasSize && record.offset > fileEnd_) {
         // It ends with a hole; its last byte gives it its length.
         constexpr std::array<std::uint8_t, 1> zero{};
@@ -249,7 +248,7 @@ Outcome<void> Unpacker::makeSymbolicLink(const Place& place) {
 Outcome<void> Unpacker::makeHardLink(const Place& place) {
     const auto target = plainName(entry_.target);
     if (!target)
-        return refused(entry_.name, "a hard link that leads out of the archive: " + target.error());
+        return refusedItem(entry_.name, "a hard link that leads out of the archive: " + target.error());
     const std::size_t slash = target->rfind('/');
     const std::string parent = slash == target->npos ? "." : target->substr(0, slash);
     const std::string name = slash == target->npos ? *target : target->substr(slash + 1);
@@ -257,7 +256,7 @@ Outcome<void> Unpacker::makeHardLink(const Place& place) {
     const auto directory = openBeneathOnMount(directory_, parent.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
     if (!directory || ::fstatat(directory->get(), name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0 ||
         !S_ISREG(status.st_mode))
-        return refused(entry_.name, "a hard link to what is no file earlier in the archive");
+        return refusedItem(entry_.name, "a hard link to what is no file earlier in the archive");
     if (const zor::Errno error =
             disk_.makeHardLink(directory->get(), name.c_str(), place.directory, place.name.c_str()))
         return cannotMake(error);
@@ -266,7 +265,7 @@ Outcome<void> Unpacker::makeHardLink(const Place& place) {
         return {};
     // Some forms keep the data of a file with the last of its names.
     if (status.st_size != 0)
-        return refused(entry_.name, "the data of its file comes twice");
+        return refusedItem(entry_.name, "the data of its file comes twice");
     auto file = openBeneathOnMount(place.directory, place.name.c_str(), O_WRONLY | O_NOFOLLOW);
     if (!file)
         return cannotMake(file.error());
@@ -277,9 +276,9 @@ Outcome<void> Unpacker::makeHardLink(const Place& place) {
 
 std::unexpected<Failure> Unpacker::cannotMake(zor::Errno error) const {
     if (error == EEXIST)
-        return refused(entry_.name, "it comes twice");
+        return refusedItem(entry_.name, "it comes twice");
     if (error == ENOTDIR || error == ELOOP)
-        return refused(entry_.name, "it lies below something that is no directory");
+        return refusedItem(entry_.name, "it lies below something that is no directory");
     return failed(zorvane::printable(entry_.name) + " cannot be written", error);
 }
 
