@@ -395,7 +395,10 @@ TEST_F(ReplaceWithoutOrder, OnlyWhoHasToDoWithItWaits) {
          [&](auto&, auto&) { // to the class that it has
              std::promise<ErrorCode> told;
              world.services().store().dataProtection.setDataProtectionOnDataContainerForUser(
-                 {.userId = mobile, .identifier = "id", .containerClass = group, .dataProtectionClass = 3},
+                 {.userId = mobile,
+                  .identifier = "id",
+                  .containerClass = group,
+                  .dataProtectionClass = platform::defaultProtectionClass},
                  [&](ErrorCode code) { told.set_value(code); });
              return told.get_future().get();
          }},

@@ -166,11 +166,12 @@ TEST(SystemMount, KeepsNoEndWaiting) {
     struct Row {
         const char* place;
         bool isWork;
+        int secondsMin;
         int secondsMax;
     };
-    for (const auto& [place, isWork, secondsMax] :
-         {Row{"private/var/containers/Data/System", false, 15},
-          Row{"private/var/root/Library/Caches/com.veltra.zorvaned/Dead", true, 70}}) {
+    for (const auto& [place, isWork, secondsMin, secondsMax] :
+         {Row{"private/var/containers/Data/System", false, 0, 15},
+          Row{"private/var/root/Library/Caches/com.veltra.zorvaned/Dead", true, 50, 70}}) {
         if (isWork && !support::isLongRun())
             continue;
         DaemonProcess daemon;
@@ -188,7 +189,8 @@ TEST(SystemMount, KeepsNoEndWaiting) {
             EXPECT_FALSE(isRemoval ? come(client.emptyDeathRow()) : come(client.createOrLookup(system)));
         });
         std::this_thread::sleep_for(std::chrono::milliseconds(200)); // it waits
-        EXPECT_LT(secondsOf([&] { EXPECT_EQ(daemon.terminate(), 0); }), secondsMax);
+        const double seconds = secondsOf([&] { EXPECT_EQ(daemon.terminate(), 0); });
+        EXPECT_TRUE(seconds > secondsMin && seconds < secondsMax) << seconds;
         request.join();
     }
 }
